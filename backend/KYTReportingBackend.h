@@ -1,0 +1,171 @@
+// The common base and the interface of all back ends: the objects to which a reporting session hands its clients'
+// events, files and log data. Created only by the factory (backend/BackendFactory.h), owned by one session in a
+// dictionary keyed by name; `cleanup` is called before the last reference goes. shared_ptr, because replies that arrive
+// on a URL session's queue hold their back end weakly.
+//
+// Threads: called on the owning session's queue; `state` and what a subclass says so are kept by the private state
+// queue. The other fields are set once, before the back end is used.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "backend/ReportingSessionConnectivityInterface.h"
+#include "platform/Clock.h"
+#include "platform/Error.h"
+#include "platform/Function.h"
+#include "platform/Value.h"
+#include "platform/ipc/ClientSessionInterface.h"
+
+namespace kyt {
+
+class SerialQueue;
+struct Platform;
+
+// Two numbers that would otherwise be mistaken for each other in the send operations.
+enum class EventID : uint16_t {};
+enum class MessageFlag : int32_t {};
+
+// The whole values that mean something; the tests are on whole values, not on single bits.
+[[nodiscard]] constexpr bool isRealtime(MessageFlag flag) {
+  return flag == MessageFlag{1} || flag == MessageFlag{3};
+}
+[[nodiscard]] constexpr bool isExpedite(MessageFlag flag) {
+  return flag == MessageFlag{2} || flag == MessageFlag{3};
+}
+
+// Delivery states. The session reports kEnabled and kHeld as live.
+inline constexpr int32_t kBackendStateUndecided = 0;
+inline constexpr int32_t kBackendStateDisabled = 1;
+inline constexpr int32_t kBackendStateEnabled = 2;
+inline constexpr int32_t kBackendStateHeld = 3;  // held by sampling
+
+// (result, error); a back end that has nothing to say calls it with neither.
+using FlushCompletion = Function<void(Value result, std::optional<Error> error)>;
+
+class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBackend> {
+ public:
+  KYTReportingBackend(const KYTReportingBackend&) = delete;
+  KYTReportingBackend& operator=(const KYTReportingBackend&) = delete;
+  virtual ~KYTReportingBackend();
+
+  // 64 lower-case hexadecimal digits of the SHA-256 of the text's UTF-8 bytes, of which only as many are hashed as the
+  // text has UTF-16 code units: for text outside ASCII a prefix, deliberately, since servers compare with such digests.
+  [[nodiscard]] String convertIntoSHA256(const String& text) const;
+
+  virtual void cleanup();
+  void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> delegate);
+  // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
+  void setSelfVersion(const String& version);
+
+  // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued before it.
+  [[nodiscard]] int32_t state() const;
+  void setState(int32_t state);
+  virtual void updateState();
+
+  // The operation that every event goes through. The returned text goes into the local message log.
+  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+                            EventID eventID, MessageFlag flag);
+  // An operation of its own: back ends that implement only this one are not reached by routed events.
+  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+                            EventID eventID);
+  // Numbers the event (1 for the first, 0 after 65535) and passes it to the six-argument operation.
+  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+                    MessageFlag flag);
+
+  void setStartTimestamp(const TimeValue& timestamp);
+  virtual Value flushMessagesWithCompletion(FlushCompletion completion);
+  // `extension` names the descriptors that came with the token; the back end that accepts takes them from there.
+  [[nodiscard]] virtual bool uploadFileAtPath(const String& path, const String& extensionToken,
+                                              std::optional<FileExtension>& extension);
+  [[nodiscard]] virtual bool uploadLogData(const Value& logData);
+  virtual void setCorrelatedSessionID(const String& sessionID);
+  // Without a list everything is allowed; an empty list allows nothing.
+  [[nodiscard]] bool isWhitelistedEvent(uint16_t category) const;
+  [[nodiscard]] bool isBlacklistedEvent(uint16_t category) const;
+  [[nodiscard]] virtual uint64_t batchedEventsSize() const;
+
+  // Plain properties.
+  [[nodiscard]] const String& name() const { return name_; }
+  [[nodiscard]] const Dictionary& profile() const { return profile_; }
+  [[nodiscard]] uint32_t sessionID() const { return sessionID_; }
+  void setSessionID(uint32_t value) { sessionID_ = value; }
+  [[nodiscard]] const std::optional<String>& combinedSessionIDString() const { return combinedSessionIDString_; }
+  void setCombinedSessionIDString(std::optional<String> value) { combinedSessionIDString_ = std::move(value); }
+  [[nodiscard]] int32_t compType() const { return compType_; }
+  void setCompType(int32_t value) { compType_ = value; }
+  [[nodiscard]] uint16_t clientVersion() const { return clientVersion_; }
+  void setClientVersion(uint16_t value) { clientVersion_ = value; }
+  [[nodiscard]] const char* udid() const { return udid_; }
+  void setUdid(const char* value) { udid_ = value; }  // borrowed: storage of the session
+  [[nodiscard]] const std::optional<String>& displayURL() const { return displayURL_; }
+  void setDisplayURL(std::optional<String> value) { displayURL_ = std::move(value); }
+  [[nodiscard]] const std::optional<String>& productVersion() const { return productVersion_; }
+  void setProductVersion(std::optional<String> value) { productVersion_ = std::move(value); }
+  [[nodiscard]] const std::optional<String>& buildVersion() const { return buildVersion_; }
+  void setBuildVersion(std::optional<String> value) { buildVersion_ = std::move(value); }
+  [[nodiscard]] const std::optional<String>& hardwareType() const { return hardwareType_; }
+  void setHardwareType(std::optional<String> value) { hardwareType_ = std::move(value); }
+  [[nodiscard]] const std::optional<String>& productFamily() const { return productFamily_; }
+  void setProductFamily(std::optional<String> value) { productFamily_ = std::move(value); }
+  [[nodiscard]] const std::optional<Dictionary>& userInfoDict() const { return userInfoDict_; }
+  virtual void setUserInfoDict(std::optional<Dictionary> value) { userInfoDict_ = std::move(value); }
+  [[nodiscard]] bool isInternal() const { return isInternal_; }
+  void setIsInternal(bool value) { isInternal_ = value; }
+  [[nodiscard]] bool requireUserInfo() const { return requireUserInfo_; }
+  void setRequireUserInfo(bool value) { requireUserInfo_ = value; }
+  [[nodiscard]] bool batchEvents() const { return batchEvents_; }
+  void setBatchEvents(bool value) { batchEvents_ = value; }
+  [[nodiscard]] double samplingFactor() const { return samplingFactor_; }
+  void setSamplingFactor(double value) { samplingFactor_ = value; }
+  [[nodiscard]] const Value& samplingThreshold() const { return samplingThreshold_; }  // a number, or null
+  void setSamplingThreshold(Value value) { samplingThreshold_ = std::move(value); }
+  [[nodiscard]] const std::optional<Data>& digestKey() const { return digestKey_; }
+  void setDigestKey(std::optional<Data> value) { digestKey_ = std::move(value); }
+  [[nodiscard]] int32_t digestAlgorithm() const { return digestAlgorithm_; }
+  void setDigestAlgorithm(int32_t value) { digestAlgorithm_ = value; }
+  [[nodiscard]] double startTimeStamp() const { return startTimeStamp_; }
+  [[nodiscard]] uint8_t selfVersionMajor() const { return selfVersionMajor_; }
+  [[nodiscard]] uint8_t selfVersionMiddle() const { return selfVersionMiddle_; }
+  [[nodiscard]] uint8_t selfVersionMinor() const { return selfVersionMinor_; }
+
+ protected:
+  // Subclasses are made through a static initWithName(...) that answers null on failure; it calls this constructor.
+  // Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
+  KYTReportingBackend(Platform& platform, String name, Dictionary profile, std::optional<String> productFamily);
+  [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> connectivityDelegate() const {
+    return reportingSessionConnectivityDelegate_.lock();
+  }
+  [[nodiscard]] SerialQueue& stateQueue() const { return *stateQueue_; }
+
+  Platform& platform_;
+  String name_;
+  Dictionary profile_;
+  int32_t state_ = 0;  // touched on the state queue only
+  std::optional<String> productVersion_, buildVersion_, hardwareType_, productFamily_;
+  double startTimeStamp_ = 0;  // seconds since 1970
+  uint32_t sessionID_ = 0;
+  std::optional<String> combinedSessionIDString_;
+  int32_t compType_ = 0;
+  uint16_t clientVersion_ = 0;
+  uint16_t eventID_ = 0;
+  uint8_t selfVersionMajor_ = 0, selfVersionMiddle_ = 0, selfVersionMinor_ = 0;
+  bool isInternal_ = false;
+  bool requireUserInfo_ = false;
+  bool shouldUseWiFiOnly_ = false;
+  std::optional<Dictionary> userInfoDict_;
+  bool batchEvents_ = false;
+  const char* udid_ = "";
+  std::optional<String> displayURL_;
+  double samplingFactor_ = 0;
+  Value samplingThreshold_;
+  std::shared_ptr<SerialQueue> stateQueue_;
+  std::optional<Array> eventWhitelist_, eventBlacklist_;
+  std::optional<Data> digestKey_;
+  int32_t digestAlgorithm_ = 0;
+  std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
+};
+
+}  // namespace kyt

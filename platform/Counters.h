@@ -1,0 +1,66 @@
+// What was dropped or refused, by reason. Any thread; one relaxed atomic each. The composition root owns the one object
+// and reports it (a line when a limit is passed, at most once a minute each, and all figures at shut-down).
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+
+#include "platform/Clock.h"
+
+namespace kyt {
+
+class Log;
+
+enum class Reason : uint8_t {
+  malformedMessage,          // a connection ended for breaking the protocol
+  invalidArguments,          // a call answered InvalidArgs
+  unentitledConnection,
+  handshakeFailed,
+  handshakeTimedOut,
+  messageTooLong,
+  tooManyConnections,
+  tooManyConnectionsOfUser,
+  queuedBytesExceeded,       // reading from a client stopped
+  clientNotReading,          // … and its connection ended
+  aggregatorMessageDropped,
+  batchFull,                 // an event dropped because its back end's batch is full
+  eventDroppedByState,       // a disabled back end dropped an event
+  batchDiscarded,            // records discarded with a batch whose back end is not enabled
+  batchedEventFiltered,      // records rejected by the lists at a flush
+  postWithoutURL,
+  postFailed,                // a request ended with a transport error; its events are lost
+  postRefused,               // a server answered 4xx or 5xx
+  waitingRequestDisplaced,   // a request dropped while waiting for connectivity
+  workersExhausted,          // work waited because all workers were in use
+  sharedDataRefused,
+  hierarchyTokenRefused,
+  uploadTooLarge,
+  customIdentifierRefused,
+  badUserDefaultsFile,
+  badEntitlementsFile,
+  valueNotPostable,          // a record's value removed because JSON cannot carry it
+  numberOfReasons
+};
+
+[[nodiscard]] const char* reasonName(Reason reason);  // "malformed-message", for logs and tools
+
+class Counters {
+ public:
+  void add(Reason reason, uint64_t count = 1) {
+    values_[static_cast<size_t>(reason)].fetch_add(count, std::memory_order_relaxed);
+  }
+  [[nodiscard]] uint64_t value(Reason reason) const {
+    return values_[static_cast<size_t>(reason)].load(std::memory_order_relaxed);
+  }
+  // add(), and whether a line about it may be written now (none was in the last minute).
+  [[nodiscard]] bool addAndMayLog(Reason reason, MonotonicTime now, uint64_t count = 1);
+
+ private:
+  static constexpr size_t kReasons = static_cast<size_t>(Reason::numberOfReasons);
+  std::array<std::atomic<uint64_t>, kReasons> values_{};
+  std::array<std::atomic<int64_t>, kReasons> lastLogged_{};  // monotonic nanoseconds, 0: never
+};
+
+}  // namespace kyt

@@ -1,0 +1,33 @@
+// Property lists and JSON to and from objects. Any thread, no state, never blocks. Input is hostile: depth is limited
+// to `Limits::maxObjectDepth`, no external entity is ever resolved, UTF-8 is checked.
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <variant>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+class PropertyLists {
+ public:
+  virtual ~PropertyLists() = default;
+  // The root object of an XML property list, or an error whose description says what is wrong and where.
+  [[nodiscard]] virtual std::variant<Value, Error> parse(std::string_view bytes) = 0;
+  // XML; objects that a property list cannot carry (null) are left out.
+  [[nodiscard]] virtual std::string serialize(const Value& value) = 0;
+};
+
+class JSON {
+ public:
+  virtual ~JSON() = default;
+  // Appends to `out`. Doubles as the shortest decimal that reads back the same; a not finite number, a date or data
+  // is written as null (callers remove those first). Keys in enumeration order.
+  virtual void writeCompact(const Value& value, std::string& out) = 0;
+  virtual void writePretty(const Value& value, std::string& out) = 0;
+  [[nodiscard]] virtual std::variant<Value, Error> parse(std::string_view text) = 0;
+};
+
+}  // namespace kyt

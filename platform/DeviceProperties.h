@@ -1,0 +1,31 @@
+// Facts about the device by property key ("ProductVersion", "BuildVersion", "ProductType", "DeviceName",
+// "HWModelStr", "SerialNumber", "UniqueDeviceID", "ReleaseType"), and what the locale and the time zone say. Any thread;
+// may read small files; no answer is an ordinary outcome.
+#pragma once
+
+#include <optional>
+#include <string_view>
+
+#include "platform/Clock.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+class DeviceProperties {
+ public:
+  virtual ~DeviceProperties() = default;
+  [[nodiscard]] virtual std::optional<String> property(std::string_view key) = 0;
+  // The current locale's country code ("DE"), or none.
+  [[nodiscard]] virtual std::optional<String> countryCode() = 0;
+  // The local time zone's offset from GMT at that time, seconds, east positive. Cheap: called for every event.
+  [[nodiscard]] virtual int64_t secondsFromGMT(TimeValue time) = 0;
+};
+
+// The device owner's consent to diagnostics-and-usage upload. No answer is no.
+class DiagnosticsConsent {
+ public:
+  virtual ~DiagnosticsConsent() = default;
+  [[nodiscard]] virtual bool isSubmissionAllowed() = 0;
+};
+
+}  // namespace kyt

@@ -1,0 +1,58 @@
+// The structured log. Three levels; every line begins with the operation that writes it. Texts are printf formats,
+// checked by the compiler. Lines below the level in force cost one relaxed load.
+//
+// A `Log` may be called from any thread, never fails and never throws. What came from outside (a client's name, a
+// server's reply) may hold anything: the sinks escape control characters and invalid UTF-8. Owned by the composition
+// root; everyone else holds a reference.
+#pragma once
+
+#include <atomic>
+#include <cstdarg>
+#include <string>
+#include <string_view>
+
+#include "platform/Value.h"
+
+namespace kyt {
+
+enum class LogLevel : int { debug = 0, normal = 1, error = 2 };  // "default" in settings and on the command line
+
+// Where lines go: journald, standard error, or a test's memory. Called from any thread, concurrently.
+class LogSink {
+ public:
+  virtual ~LogSink() = default;
+  virtual void write(LogLevel level, std::string_view line) = 0;
+};
+
+class Log {
+ public:
+  explicit Log(LogSink& sink, LogLevel level = LogLevel::normal) : sink_(&sink), level_(static_cast<int>(level)) {}
+  Log(const Log&) = delete;
+  Log& operator=(const Log&) = delete;
+
+  void setLevel(LogLevel level) { level_.store(static_cast<int>(level), std::memory_order_relaxed); }
+  // Only before other threads exist.
+  void setSink(LogSink& sink) { sink_ = &sink; }
+  [[nodiscard]] bool enabled(LogLevel level) const {
+    return static_cast<int>(level) >= level_.load(std::memory_order_relaxed);
+  }
+  [[nodiscard]] bool debugEnabled() const { return enabled(LogLevel::debug); }
+
+  void debug(const char* format, ...) __attribute__((format(printf, 2, 3)));
+  void normal(const char* format, ...) __attribute__((format(printf, 2, 3)));  // the level "default"
+  void error(const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+  // For the formats that show an object as "%@": every "%@" and "%s" takes the next argument, a Value, as its
+  // description. No other conversion may stand in such a format.
+  void debugObjects(const char* format, std::initializer_list<Value> objects);
+
+ private:
+  void write(LogLevel level, const char* format, va_list arguments);
+  LogSink* sink_;
+  std::atomic<int> level_;
+};
+
+// Fills a "%@" template: every "%@" takes the next object's description, "%%" is a percent sign.
+[[nodiscard]] std::string formatObjects(const char* format, std::initializer_list<Value> objects);
+
+}  // namespace kyt

@@ -1,0 +1,46 @@
+// All ports of the operating system that the daemon's folders use, as references that the composition root fills in.
+// Everything outlives everything that holds a Platform&.
+#pragma once
+
+namespace kyt {
+
+class Bundle;
+class Clock;
+class Counters;
+class Cryptography;
+class Deflate;
+class DeviceProperties;
+class DiagnosticsConsent;
+class Executor;
+class JSON;
+class Log;
+class MemoryInfo;
+class PropertyLists;
+class RandomSource;
+class TimerService;
+class URLSessionFactory;
+class UserDefaults;
+struct Limits;
+
+struct Platform {
+  const Limits& limits;
+  Counters& counters;
+  Log& log;
+  Clock& clock;
+  TimerService& timers;
+  Executor& executor;
+  RandomSource& random;
+  UserDefaults& userDefaults;
+  DeviceProperties& deviceProperties;
+  DiagnosticsConsent& consent;
+  Cryptography& cryptography;
+  PropertyLists& propertyLists;
+  JSON& json;
+  Deflate& deflate;
+  MemoryInfo& memory;
+  URLSessionFactory& urlSessions;
+  Bundle& clientBundle;  // KYTReporting.bundle: version, publicKey.der
+  Bundle& daemonBundle;  // kytreportingd.bundle: version
+};
+
+}  // namespace kyt

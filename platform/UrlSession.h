@@ -1,0 +1,85 @@
+// HTTP requests. Callers: the storebag fetch (one process-wide session) and the connectivity helper of each reporting
+// session. The real one is libcurl on one network thread (platform/linux/CurlUrlSession.h).
+//
+// start() may be called from any thread and never blocks. A completion runs exactly once, on the URL session's own
+// serial delegate queue, never on the caller's thread before start() has returned, never on the network thread.
+// Only http and https; TLS 1.2 or newer, always verified; no cookies, no cache. 60 s without progress is a time-out;
+// a reply body over `Limits::maxHTTPReplyBytes` is an error.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/Clock.h"
+#include "platform/Error.h"
+#include "platform/Function.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+// The domain of transport failures; the code is libcurl's (CURLcode), or one of the two below.
+inline constexpr char kKYTURLErrorDomain[] = "KYTURLErrorDomain";
+inline constexpr int32_t kURLErrorCancelled = -999;         // the session was cancelled (shut-down)
+inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;   // displaced while waiting for connectivity
+
+struct URLRequest {
+  std::string method = "GET";
+  std::string url;
+  std::vector<std::pair<std::string, std::string>> headers;  // sent in this order; control characters are removed
+  Data body;
+  std::optional<Duration> timeout;  // from start to end, progress or not; none: only the no-progress time-out
+  bool allowsCellularAccess = true;
+  int maxRedirects = 0;             // followed only while they stay on https
+};
+
+struct URLResponse {
+  int status = 0;
+  std::vector<std::pair<std::string, std::string>> headers;  // of the last response, in order, names as received
+  // The first header of that name, compared without case.
+  [[nodiscard]] std::optional<std::string_view> header(std::string_view name) const;
+};
+
+// (data, response, error): with an error there is no response, and data is empty.
+using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
+
+struct URLSessionConfiguration {
+  std::string sourceApplication;     // sent as X-KYT-Source-Application; empty: not sent
+  bool waitsForConnectivity = false;  // a request that cannot leave (no route, no resolver) waits for the network
+};
+
+// A handle to a request that was started; dropping it changes nothing.
+class URLTask {
+ public:
+  virtual ~URLTask() = default;
+  virtual void cancel() = 0;  // its completion gets kURLErrorCancelled unless it has run
+};
+
+// One connection pool. Destroying it is finishTasksAndInvalidate().
+class URLSession {
+ public:
+  virtual ~URLSession() = default;
+  virtual std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) = 0;
+  // Requests already started still complete and call their completions; later ones fail with kURLErrorCancelled.
+  virtual void finishTasksAndInvalidate() = 0;
+};
+
+struct URLFigures {
+  uint64_t started = 0, completed = 0, failed = 0, waiting = 0, waitingBytes = 0, droppedWhileWaiting = 0;
+};
+
+class URLSessionFactory {
+ public:
+  virtual ~URLSessionFactory() = default;
+  [[nodiscard]] virtual std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) = 0;
+  // Shut-down: every request of every session ends with kURLErrorCancelled, and none can be started any more.
+  virtual void cancelAll() = 0;
+  [[nodiscard]] virtual URLFigures figures() const = 0;
+  // Requests not completed yet; the daemon's shut-down waits for zero.
+  [[nodiscard]] virtual size_t outstanding() const = 0;
+};
+
+}  // namespace kyt

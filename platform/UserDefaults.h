@@ -1,0 +1,31 @@
+// Preferences by domain and key, readable and changeable by an administrator while the daemon runs.
+//
+// Callers: the environment and storebag address, the HTTPS back end's overrides and identifiers, the consent. Any
+// thread; reads block for a stat() at most, and for a small file read after a change; set() for a write and rename.
+#pragma once
+
+#include <optional>
+#include <string_view>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+inline constexpr char kKYTReportingDefaultsDomain[] = "com.vantu.kytreporting";
+inline constexpr char kDiagnosticsDefaultsDomain[] = "com.vantu.diagnostics";
+inline constexpr char kTimedDefaultsDomain[] = "com.vantu.timed";
+
+class UserDefaults {
+ public:
+  virtual ~UserDefaults() = default;
+  // Strings, booleans, integers and doubles; null when the key has no value or the file cannot be read.
+  [[nodiscard]] virtual Value value(std::string_view domain, std::string_view key) = 0;
+  // A null value removes the key. Replaces the file atomically; an error leaves what was there.
+  [[nodiscard]] virtual std::optional<Error> set(std::string_view domain, std::string_view key, Value value) = 0;
+  // Stores `value` unless the key already has a string; answers what is stored afterwards, also under concurrent
+  // callers of other processes. On an error answers `value`, unstored (counted and logged by the adapter).
+  [[nodiscard]] virtual String stringOrStore(std::string_view domain, std::string_view key, String value) = 0;
+};
+
+}  // namespace kyt

@@ -1,0 +1,58 @@
+// The elastic worker pool: the threads that run serial queues.
+//
+// Several operations block by design (a storebag download, uploads, the wait for the agent's monitor while it is held
+// by a download). A worker announces that with a BlockingScope, and the pool then keeps enough others running. At
+// most `Limits::maxWorkers` threads exist; the queues of one owner occupy at most half of them; work past that waits,
+// counted. Idle workers end after a while, the last one stays only while work was seen recently, so an idle daemon has
+// no wake-ups.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+
+#include "platform/Clock.h"
+#include "platform/Executor.h"
+
+namespace kyt {
+
+struct WorkerPoolOptions {
+  size_t runnable = 0;      // workers that may run without being blocked; 0: the number of processors, at least 2
+  size_t maxWorkers = 512;  // threads in all
+  Duration idleExit = std::chrono::seconds(10);
+  const char* name = "kyt-worker";             // at most 12 bytes; a number follows
+  void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
+};
+
+struct WorkerPoolFigures {
+  size_t workers = 0, blocked = 0, waitingQueues = 0, mostWorkers = 0;
+};
+
+class WorkerPool final : public Executor {
+ public:
+  explicit WorkerPool(WorkerPoolOptions options);
+  ~WorkerPool() override;  // shutDown()
+  void submit(std::shared_ptr<SerialQueue> queue) override;
+  // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a worker.
+  void shutDown();
+  [[nodiscard]] WorkerPoolFigures figures() const;
+
+ private:
+  friend class BlockingScope;
+  class Implementation;
+  std::unique_ptr<Implementation> implementation_;
+};
+
+// Announces that this thread is about to wait for something that takes long. No effect on threads that are no workers.
+// Before it waits, whatever this thread's turn deferred is handed to the executors.
+class BlockingScope {
+ public:
+  BlockingScope();
+  ~BlockingScope();
+  BlockingScope(const BlockingScope&) = delete;
+  BlockingScope& operator=(const BlockingScope&) = delete;
+
+ private:
+  void* worker_;
+};
+
+}  // namespace kyt

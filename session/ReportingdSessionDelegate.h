@@ -1,0 +1,38 @@
+// All that a session knows of the agent. The agent is also the lock object for shared-data and hierarchy calls: the
+// operations that say so are called while holding `monitor()`.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/Mutex.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+class ReportingdSession;
+
+class ReportingdSessionDelegate {
+ public:
+  virtual ~ReportingdSessionDelegate() = default;
+  [[nodiscard]] virtual std::string description() const = 0;
+  [[nodiscard]] virtual Monitor& monitor() = 0;
+
+  // The section for the session's client type, from the cache or freshly fetched (blocks), or none.
+  [[nodiscard]] virtual std::optional<Dictionary> storebagForSession(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::optional<String> storebagVersionForSession(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::optional<String> parentSessionIDStringForSession(ReportingdSession& session) = 0;
+  virtual void updateCorrelatedSessions(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(
+      ReportingdSession& session) = 0;
+  virtual void updateDownstreamSessions(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::shared_ptr<ReportingdSession> parentSessionForChild(ReportingdSession& session) = 0;
+  virtual void updateSharedDataForSession(ReportingdSession& session, const Dictionary& sharedData) = 0;
+  virtual void removeObjectFromSharedDataForSession(ReportingdSession& session, const String& key) = 0;
+  [[nodiscard]] virtual std::optional<Dictionary> sharedDataForSession(ReportingdSession& session) = 0;
+  // Called while holding monitor().
+  virtual void addAgentHealthInfoForSession(ReportingdSession& session, Dictionary& payload) = 0;
+};
+
+}  // namespace kyt
