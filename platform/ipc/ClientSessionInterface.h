@@ -9,6 +9,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <utility>
 
 #include "platform/Error.h"
 #include "platform/Function.h"
