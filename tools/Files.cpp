@@ -1,0 +1,64 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+
+#include "tools/StorebagFile.h"
+
+namespace kyt::tools {
+
+namespace {
+
+Error failure(const std::string& path) {
+  return Error{"KYTToolsErrorDomain", errno, path + ": " + std::strerror(errno)};
+}
+
+bool writeAll(int fd, std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t written = write(fd, bytes.data(), bytes.size());
+    if (written < 0 && errno == EINTR) continue;
+    if (written < 0) return false;
+    bytes.remove_prefix(static_cast<size_t>(written));
+  }
+  return true;
+}
+
+}  // namespace
+
+std::variant<std::string, Error> readFile(const std::string& path) {
+  const int fd = path == "-" ? dup(STDIN_FILENO) : open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return failure(path);
+  std::string out;
+  char buffer[65536];
+  for (;;) {
+    const ssize_t got = read(fd, buffer, sizeof buffer);
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) {
+      Error error = failure(path);
+      close(fd);
+      return error;
+    }
+    if (got == 0) break;
+    out.append(buffer, static_cast<size_t>(got));
+  }
+  close(fd);
+  return out;
+}
+
+std::optional<Error> writeFile(const std::string& path, std::string_view bytes, unsigned mode) {
+  std::string temporary = path + ".XXXXXX";
+  const int fd = mkostemp(temporary.data(), O_CLOEXEC);
+  if (fd < 0) return failure(path);
+  const bool done = fchmod(fd, mode) == 0 && writeAll(fd, bytes) && fsync(fd) == 0;
+  std::optional<Error> error;
+  if (!done) error = failure(path);
+  close(fd);
+  if (!error && std::rename(temporary.c_str(), path.c_str()) != 0) error = failure(path);
+  if (error) unlink(temporary.c_str());
+  return error;
+}
+
+}  // namespace kyt::tools

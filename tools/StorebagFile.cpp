@@ -1,0 +1,202 @@
+#include "tools/StorebagFile.h"
+
+#include <openssl/bio.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/rsa.h>
+#include <openssl/x509.h>
+
+#include <memory>
+
+#include "platform/Cryptography.h"
+#include "platform/DataServices.h"
+#include "platform/System.h"
+#include "tools/TomlValues.h"
+
+namespace kyt::tools {
+
+namespace {
+
+constexpr char kDomain[] = "KYTToolsErrorDomain";
+
+Error failure(std::string text) {
+  return Error{kDomain, -1, std::move(text)};
+}
+
+template <typename T, void (*Free)(T*)>
+struct Freer {
+  void operator()(T* object) const { Free(object); }
+};
+void freeBIO(BIO* bio) {
+  BIO_free_all(bio);
+}
+using KeyPointer = std::unique_ptr<EVP_PKEY, Freer<EVP_PKEY, EVP_PKEY_free>>;
+using BIOPointer = std::unique_ptr<BIO, Freer<BIO, freeBIO>>;
+using DigestPointer = std::unique_ptr<EVP_MD_CTX, Freer<EVP_MD_CTX, EVP_MD_CTX_free>>;
+
+std::string contents(BIO* bio) {
+  char* bytes = nullptr;
+  const long length = BIO_get_mem_data(bio, &bytes);
+  return length > 0 ? std::string(bytes, static_cast<size_t>(length)) : std::string();
+}
+
+KeyPointer privateKey(std::string_view pem) {
+  BIOPointer bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  KeyPointer key(PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, nullptr));
+  if (key && EVP_PKEY_get_base_id(key.get()) != EVP_PKEY_RSA) key.reset();
+  return key;
+}
+
+std::optional<std::string> signature(EVP_PKEY* key, std::string_view bytes) {
+  DigestPointer context(EVP_MD_CTX_new());
+  size_t length = 0;
+  const auto* data = reinterpret_cast<const unsigned char*>(bytes.data());
+  if (EVP_DigestSignInit(context.get(), nullptr, EVP_sha1(), nullptr, key) != 1 ||
+      EVP_DigestSign(context.get(), nullptr, &length, data, bytes.size()) != 1)
+    return std::nullopt;
+  std::string out(length, '\0');
+  if (EVP_DigestSign(context.get(), reinterpret_cast<unsigned char*>(out.data()), &length, data,
+                     bytes.size()) != 1)
+    return std::nullopt;
+  out.resize(length);
+  return out;
+}
+
+const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->dictionary() : nullptr;
+}
+
+void warnAboutFilters(const Dictionary& client, const std::string& where, std::vector<std::string>& out) {
+  const Value* filters = client.find("filters");
+  if (filters == nullptr || filters->array() == nullptr) {
+    out.push_back(where + ": no \"filters\" array: sessions that require user information are disabled");
+    return;
+  }
+  size_t index = 0;
+  for (const Value& element : *filters->array()) {
+    const std::string at = where + ", filter " + std::to_string(index++);
+    const Dictionary* filter = element.dictionary();
+    if (filter == nullptr) {
+      out.push_back(at + ": not a dictionary");
+      continue;
+    }
+    const Value* action = filter->find("action");
+    const String* text = action != nullptr ? action->string() : nullptr;
+    if (text == nullptr || (*text != "remove" && *text != "sha256"))
+      out.push_back(at + ": the action is neither \"remove\" nor \"sha256\" (case counts): the key is kept");
+    if (!filter->contains("key")) out.push_back(at + ": no \"key\": it matches nothing");
+    if (filter->contains("method") || filter->contains("status"))
+      out.push_back(
+          at +
+          ": bound to a method or status: it does not touch the copy of the user information that a flush"
+          " merges into batched events (that copy has neither)");
+  }
+}
+
+void warnAboutClients(const Dictionary& backend, const std::string& where, std::vector<std::string>& out) {
+  const Value* clients = backend.find("clients");
+  if (clients == nullptr || clients->array() == nullptr) {
+    out.push_back(where + ": no \"clients\" array: the back end is not created");
+    return;
+  }
+  size_t index = 0;
+  for (const Value& element : *clients->array()) {
+    const std::string at = where + ", client " + std::to_string(index++);
+    const Dictionary* client = element.dictionary();
+    if (client == nullptr) {
+      out.push_back(at + ": not a dictionary");
+      continue;
+    }
+    const Value* locales = client->find("locale_whitelist");
+    if (locales == nullptr || locales->array() == nullptr || locales->array()->empty())
+      out.push_back(at + ": no \"locale_whitelist\": sessions that require user information are disabled");
+    if (!client->contains("sampling_threshold") && !client->contains("per_country_sampling_thresholds"))
+      out.push_back(at + ": no \"sampling_threshold\": sessions that require user information are disabled");
+    if (!client->contains("post_url")) out.push_back(at + ": no \"post_url\": events have nowhere to go");
+    if (!client->contains("event_threshold"))
+      out.push_back(at +
+                    ": no \"event_threshold\": it is 0, and nearly every batched event flushes the batch");
+    warnAboutFilters(*client, at, out);
+  }
+}
+
+}  // namespace
+
+std::variant<KeyPair, Error> makeKeyPair(unsigned bits) {
+  if (bits < 2048 || bits > 16384) return failure("a key has between 2048 and 16384 bits");
+  KeyPointer key(EVP_RSA_gen(bits));
+  if (!key) return failure("no key could be made");
+  BIOPointer pem(BIO_new(BIO_s_mem())), der(BIO_new(BIO_s_mem()));
+  if (PEM_write_bio_PKCS8PrivateKey(pem.get(), key.get(), nullptr, nullptr, 0, nullptr, nullptr) != 1 ||
+      i2d_PUBKEY_bio(der.get(), key.get()) != 1)
+    return failure("the key could not be written");
+  return KeyPair{contents(pem.get()), contents(der.get())};
+}
+
+std::variant<Dictionary, Error> StorebagFile::read(std::string_view text, std::string_view format) const {
+  std::variant<Value, Error> parsed = failure("unknown format: a bag is .json, .toml or .plist");
+  if (format == "json") parsed = json_.parse(text);
+  if (format == "toml") parsed = parseToml(text);
+  if (format == "plist") parsed = propertyLists_.parse(text);
+  if (auto* error = std::get_if<Error>(&parsed)) return std::move(*error);
+  if (const Dictionary* bag = std::get<Value>(parsed).dictionary()) return *bag;
+  return failure("the root of a bag is a dictionary");
+}
+
+std::variant<std::string, Error> StorebagFile::sign(const Dictionary& bag,
+                                                    std::string_view privateKeyPEM) const {
+  const Value* version = bag.find("version");
+  if (version == nullptr || !version->isString()) return failure("a bag needs a \"version\" text");
+  const KeyPointer key = privateKey(privateKeyPEM);
+  if (!key) return failure("this is no RSA private key in PEM form");
+  const std::string bytes = propertyLists_.serialize(bag);
+  const std::optional<std::string> signed_ = signature(key.get(), bytes);
+  if (!signed_) return failure("the bag could not be signed");
+  Dictionary document;
+  document.set("signature", base64(std::as_bytes(std::span(*signed_))));
+  document.set("bag", base64(std::as_bytes(std::span(bytes))));
+  return propertyLists_.serialize(document);
+}
+
+std::variant<Dictionary, Error> StorebagFile::open(std::string_view document,
+                                                   std::optional<std::string_view> publicKeyDER) const {
+  std::variant<Value, Error> parsed = propertyLists_.parse(document);
+  if (auto* error = std::get_if<Error>(&parsed)) return std::move(*error);
+  const Dictionary* root = std::get<Value>(parsed).dictionary();
+  if (root == nullptr) return failure("the root of a storebag is a dictionary");
+  const auto decoded = [root](std::string_view key) -> std::optional<Data> {
+    const Value* value = root->find(key);
+    return value != nullptr && value->isString() ? base64Decode(*value->string()) : std::nullopt;
+  };
+  const std::optional<Data> signed_ = decoded("signature"), bag = decoded("bag");
+  if (!signed_ || !bag) return failure("\"signature\" and \"bag\" must be base64 texts");
+  if (publicKeyDER) {
+    const auto key = cryptography_.publicKeyFromDER(std::as_bytes(std::span(*publicKeyDER)));
+    if (!key) return failure("the public key is no RSA SubjectPublicKeyInfo in DER form");
+    if (!key->verifySHA1(cryptography_.sha1(bag->bytes()), signed_->bytes()))
+      return failure("the signature does not match the bag and this key");
+  }
+  return read(bag->view(), "plist");
+}
+
+std::vector<std::string> StorebagFile::warnings(const Dictionary& bag) {
+  std::vector<std::string> out;
+  if (const Value* version = bag.find("version"); version == nullptr || !version->isString())
+    out.emplace_back("no \"version\" text: daemons refuse the bag");
+  if (const Value* cycle = bag.find("refresh_cycle"); cycle != nullptr && cycle->intValue() > 86400)
+    out.emplace_back("\"refresh_cycle\" is over 86400 seconds: it counts as 86400");
+  bool any = false;
+  for (const char* section : {"development", "vantu_internal", "seed", "release"}) {
+    const Dictionary* table = dictionaryAt(bag, section);
+    if (table == nullptr) continue;
+    any = true;
+    for (const char* name : {"httppost", "httppost2", "qrs"})
+      if (const Dictionary* backend = dictionaryAt(*table, name))
+        warnAboutClients(*backend, std::string(section) + "/" + name, out);
+  }
+  if (!any) out.emplace_back("no section: development, vantu_internal, seed or release");
+  return out;
+}
+
+}  // namespace kyt::tools
