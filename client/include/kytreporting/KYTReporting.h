@@ -1,0 +1,146 @@
+// libkytreporting: reporting events to kytreportingd from C++.
+//
+// One KYTReporting object is one reporting session: it describes its program to the daemon, and then sends
+// messages, each a category, a type, an optional flag and a payload. Nothing here ever blocks the caller on
+// the daemon or the network: calls put work into a bounded queue, and one thread of the library
+// ("kytreporting", started with the first session, shared by all) talks to the daemon. What does not fit is
+// dropped and counted in `statistics()`; nothing is lost silently.
+//
+// The daemon may not run yet, may die, may return: the library connects again, replays the session's
+// information, its configuration, its shared data and its digest key, and counts what was lost.
+//
+// Threads: every operation may be called from any thread. Completions and the aggregation block run on the
+// library's thread, one at a time; they must not block, and may call anything here. A completion runs exactly
+// once: with the daemon's answer, or with an error when the connection ends or the session closes first.
+// Ownership: arguments are copied (objects share their contents, copying costs a pointer).
+// Errors: values; nothing throws but std::bad_alloc.
+// Fork: in a child process made by fork() the sessions of the parent are inert: sending answers false.
+// Exit: a process may end at any time; `finish()` first, if what is queued matters.
+//
+// Link with -lkytreporting (pkg-config kytreporting; CMake kytreporting::kytreporting).
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Error.h"
+#include "platform/Function.h"
+#include "platform/Keys.h"
+#include "platform/Value.h"
+
+#if defined(__GNUC__)
+#define KYT_EXPORT __attribute__((visibility("default")))
+#else
+#define KYT_EXPORT
+#endif
+
+namespace kyt {
+
+// The domain of errors that the library itself gives, and their codes.
+inline constexpr char kKYTReportingClientErrorDomain[] = "KYTReportingClientErrorDomain";
+enum class ClientError : int32_t {
+  notConnected = 1,  // the connection ended before the answer
+  closed = 2,        // the session was closed, or belongs to the parent of this process
+  queueFull = 3,     // the bounded queue had no room
+  refused = 4,       // the daemon answered with an error (the description has its text)
+};
+
+// A message that this session receives for itself and its descendants, when it aggregates. The last one, when
+// the daemon ends the aggregation, has no session information, no payload, and zeros.
+struct AggregatedMessage {
+  std::optional<Dictionary> sessionInfo;
+  double timestamp = 0;  // seconds since 1970
+  uint16_t category = 0;
+  uint16_t type = 0;
+  std::optional<Dictionary> payload;
+};
+
+class KYT_EXPORT KYTReporting {
+ public:
+  struct Options {
+    // The daemon's socket. Empty: the environment's KYTREPORTING_SOCKET, or
+    // /run/kytreportingd/com.vantu.kytreportingd.
+    std::string socketPath;
+    // Keys: kKYTReportingSessionInfo… (SessionID 32 bits, ClientType 0 to 23, ClientVersion 16 bits,
+    // BatchEvent, RequireUserInfo, HierarchyToken).
+    Dictionary sessionInfo;
+    std::optional<Dictionary> userInfo;  // kKYTReportingUserInfo… and whatever else every event shall carry
+    Value frameworksToCheck;
+    // Given: the session aggregates.
+    Function<void(const AggregatedMessage&)> aggregationBlock;
+    // Bounds of the queue towards the daemon: messages (64 to 65536) and the bytes of their encoded form.
+    size_t maxQueuedMessages = 4096;
+    size_t maxQueuedBytes = 4u << 20;
+  };
+
+  struct Statistics {
+    uint64_t sent = 0;              // messages written to the daemon's socket
+    uint64_t droppedQueueFull = 0;  // refused by sendMessage because the queue was full
+    uint64_t lostOnConnectionEnd =
+        0;                        // written or queued, but their connection ended before the daemon took them
+    uint64_t droppedClosed = 0;   // sent after close, or in a child process
+    uint64_t droppedInvalid = 0;  // could not be encoded (too large, no UTF-8, nested too deep)
+    uint64_t connections = 0;     // connections made, the first included
+    uint64_t queued = 0;          // in the queue now
+  };
+
+  // Never blocks and never fails: a daemon that does not run yet is waited for.
+  [[nodiscard]] static std::unique_ptr<KYTReporting> open(Options options);
+  // Closes without waiting: what was queued and not written is counted as lost. finish() first to keep it.
+  ~KYTReporting();
+  KYTReporting(const KYTReporting&) = delete;
+  KYTReporting& operator=(const KYTReporting&) = delete;
+
+  using StatesCompletion = Function<void(std::optional<std::vector<std::string>>, std::optional<Error>)>;
+  using ObjectCompletion = Function<void(Value, std::optional<Error>)>;
+  using TextCompletion = Function<void(std::string, std::optional<Error>)>;
+  using SuccessCompletion = Function<void(bool, std::optional<Error>)>;
+
+  // Asks the daemon to configure the session from its storebag. The completion gets the names of the live
+  // back ends; none (and no error) when there is no storebag. May be empty.
+  void startConfiguration(StatesCompletion completion = nullptr);
+  // New user information; none: as it was.
+  void fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion = nullptr);
+  void fetchDisplayURL(TextCompletion completion);
+
+  // Queues one message; whether it was taken. No system call, no wait for a lock (a sleeping library thread
+  // is woken by the first message after a pause). Flags: 1 realtime, 2 expedite, 3 both, anything else
+  // neither.
+  bool sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag = 0);
+  // The same with the daemon's answer: the text of what was posted, or none.
+  void sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag,
+                   ObjectCompletion completion);
+  // Everything queued before it is sent first; the completion gets the result or the first back end's error.
+  void flush(ObjectCompletion completion = nullptr);
+
+  void updateSharedData(Dictionary entries);
+  void updateSharedData(String key, Value value);  // null removes the key
+  // Key for the digests of the "qrs" back end's posts; algorithm 0 is HMAC-SHA1.
+  void setDigestKey(Data key, int32_t algorithm);
+
+  // Asks for uploads; the answer is whether a back end took it. The file is opened here, with the caller's
+  // rights.
+  void uploadFile(const std::string& path, SuccessCompletion completion = nullptr);
+  void uploadLogData(Array logData, SuccessCompletion completion = nullptr);
+
+  // Says goodbye: what is queued is sent, the session is marked as finished gracefully and closed. Waits for
+  // that at most `timeout` of real time; whether all was sent.
+  bool finish(std::chrono::milliseconds timeout = std::chrono::seconds(5));
+
+  [[nodiscard]] Statistics statistics() const;
+
+  // One event without a session of its own: the completion gets "finished", or what went wrong.
+  static void sendSingleMessage(Options options, uint16_t category, uint16_t type,
+                                std::optional<Dictionary> payload, TextCompletion completion);
+
+ private:
+  class Implementation;
+  explicit KYTReporting(std::shared_ptr<Implementation> implementation);
+  std::shared_ptr<Implementation> implementation_;  // shared with the library's thread
+};
+
+}  // namespace kyt
