@@ -1,10 +1,10 @@
-// The two protocols of the IPC service, as the daemon's code sees them: what a client calls on its session, and the
-// one operation that the daemon calls on its client. The wire form is the D-Bus interface description in
-// docs/com.vantu.kytreportingd.xml; platform/ipc/ translates.
+// The two protocols of the IPC service, as the daemon's code sees them: what a client calls on its session,
+// and the one operation that the daemon calls on its client. The wire form is the D-Bus interface description
+// in docs/com.vantu.kytreportingd.xml; platform/ipc/ translates.
 //
-// All operations of ClientSessionInterface are called on the connection's serial IPC queue, one at a time. Each reply
-// may be called from any thread, at once or later, exactly once; one that is dropped uncalled answers the client with
-// an error. Arguments are the callee's own.
+// All operations of ClientSessionInterface are called on the connection's serial IPC queue, one at a time.
+// Each reply may be called from any thread, at once or later, exactly once; one that is dropped uncalled
+// answers the client with an error. Arguments are the callee's own.
 #pragma once
 
 #include <cstdint>
@@ -44,9 +44,9 @@ struct FileExtension {
   Descriptor folder;  // its folder, opened with O_PATH
 };
 
-using StatesReply = Function<void(std::optional<Array>)>;       // back-end names, or none
+using StatesReply = Function<void(std::optional<Array>)>;  // back-end names, or none
 using StringReply = Function<void(String)>;
-using ObjectReply = Function<void(Value)>;                       // null: none
+using ObjectReply = Function<void(Value)>;  // null: none
 using ResultReply = Function<void(Value, std::optional<Error>)>;
 using SuccessReply = Function<void(bool)>;
 using SuccessErrorReply = Function<void(bool, std::optional<Error>)>;
@@ -54,8 +54,8 @@ using SuccessErrorReply = Function<void(bool, std::optional<Error>)>;
 class ClientSessionInterface {
  public:
   virtual ~ClientSessionInterface() = default;
-  virtual void setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo, Value frameworksToCheck,
-                              bool hasAggregationBlock) = 0;
+  virtual void setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
+                              Value frameworksToCheck, bool hasAggregationBlock) = 0;
   virtual void startConfigWithCompletionHandler(StatesReply reply) = 0;
   virtual void fetchStatesWithUserInfo(std::optional<Dictionary> userInfo, StatesReply reply) = 0;
   virtual void fetchDisplayURL(StringReply reply) = 0;
@@ -78,9 +78,11 @@ class ClientSessionInterface {
 class ClientSessionReplyInterface {
  public:
   virtual ~ClientSessionReplyInterface() = default;
-  // One way. An error means that the message could not be queued for the client (it is gone, or reads too slowly).
+  // One way. An error means that the message could not be queued for the client (it is gone, or reads too
+  // slowly).
   [[nodiscard]] virtual std::optional<Error> sendMessageToClient(std::optional<Dictionary> sessionInfo,
-                                                                 double timestamp, uint16_t category, uint16_t type,
+                                                                 double timestamp, uint16_t category,
+                                                                 uint16_t type,
                                                                  std::optional<Dictionary> payload) = 0;
 };
 

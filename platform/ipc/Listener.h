@@ -25,13 +25,14 @@ class Connection {
   [[nodiscard]] virtual uint32_t peerUser() const = 0;
   // Called before resume(). The connection keeps the object until it is invalidated.
   virtual void setExportedObject(std::shared_ptr<ClientSessionInterface> object) = 0;
-  // Run on the connection's queue. An interruption comes before an invalidation when the stream broke in the middle of
-  // a message or by an error; the invalidation comes exactly once, last, after every call that was read has been
-  // handled, and then both handlers and the exported object are dropped.
+  // Run on the connection's queue. An interruption comes before an invalidation when the stream broke in the
+  // middle of a message or by an error; the invalidation comes exactly once, last, after every call that was
+  // read has been handled, and then both handlers and the exported object are dropped.
   virtual void setInterruptionHandler(Task handler) = 0;
   virtual void setInvalidationHandler(Task handler) = 0;
   virtual void resume() = 0;
-  // Ends the connection: what was queued is written as far as the socket takes it without waiting. Any thread.
+  // Ends the connection: what was queued is written as far as the socket takes it without waiting. Any
+  // thread.
   virtual void invalidate() = 0;
   // Shut-down: stops reading, runs the invalidation handler on the queue, writes what is queued, then closes.
   virtual void finish() = 0;
@@ -44,9 +45,10 @@ class Listener;
 class ListenerDelegate {
  public:
   virtual ~ListenerDelegate() = default;
-  // Called for each new connection before a byte was read from it, on the connection's queue. NO closes it at once.
-  [[nodiscard]] virtual bool listenerShouldAcceptNewConnection(Listener& listener,
-                                                               const std::shared_ptr<Connection>& connection) = 0;
+  // Called for each new connection before a byte was read from it, on the connection's queue. NO closes it at
+  // once.
+  [[nodiscard]] virtual bool listenerShouldAcceptNewConnection(
+      Listener& listener, const std::shared_ptr<Connection>& connection) = 0;
 };
 
 class Listener {
