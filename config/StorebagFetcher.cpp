@@ -1,0 +1,239 @@
+#include "config/StorebagFetcher.h"
+
+#include <algorithm>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <variant>
+
+#include "config/ClientTypes.h"
+#include "config/Environment.h"
+#include "platform/Cryptography.h"
+#include "platform/DataServices.h"
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/Semaphore.h"
+#include "platform/System.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr Duration kRequestTimeout = std::chrono::seconds(15);
+constexpr int kMaxRedirects = 5;
+constexpr char kFallbackStorebagName[] = "cadmor";
+
+// What sessions of the family "cadmor" get while their server cannot be reached. Built in, so never verified.
+Dictionary fallbackStorebag() {
+  const Dictionary section{{"qdx", Dictionary{{"active", true}}}};
+  return Dictionary{{"vantu_internal", section},
+                    {"development", section},
+                    {"release", section},
+                    {"version", "1.0.0-Cadmor-Fallback"},
+                    {"refresh_cycle", 3600}};
+}
+
+// The number after "max-age" in a "Cache-Control" header. Only pieces between "=" and blanks are looked at,
+// so a comma that touches the word hides it, deliberately: servers' answers have been tuned to this reading.
+int32_t maxAgeFromCacheControl(std::optional<std::string_view> header) {
+  if (!header) return kMaxStorebagAge;
+  bool found = false;
+  size_t begin = 0;
+  while (begin <= header->size()) {
+    const size_t end = std::min(header->find_first_of("= ", begin), header->size());
+    const std::string_view piece = header->substr(begin, end - begin);
+    if (found) return Value(piece).intValue();
+    found = piece == "max-age";
+    begin = end + 1;
+  }
+  return kMaxStorebagAge;
+}
+
+const String* stringEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->string() : nullptr;
+}
+
+const Dictionary* sectionEntry(const Dictionary& bag, const std::optional<String>& name) {
+  const Value* value = name ? bag.find(*name) : nullptr;
+  return value != nullptr ? value->dictionary() : nullptr;
+}
+
+std::optional<Data> decodedEntry(const Dictionary& dictionary, const char* key) {
+  const String* text = stringEntry(dictionary, key);
+  if (text == nullptr) return std::nullopt;
+  return base64Decode(*text);
+}
+
+}  // namespace
+
+StorebagFetcher::StorebagFetcher(Configuration configuration, Mutex& backendClassLock)
+    : configuration_(configuration), backendClassLock_(backendClassLock) {}
+
+std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::optional<String>& name,
+                                                                 int32_t& maxAge, bool& notModified,
+                                                                 std::optional<String>* lastModified) {
+  Log& log = configuration_.platform.log;
+  const String version = configuration_.platform.clientBundle.version().value_or("8.0");
+  URLRequest request;
+  request.url = formatObjects("%@/%@?version=%@", {configuration_.environment.storebagServerURL(),
+                                                   name ? Value(*name) : Value(), version});
+  request.timeout = kRequestTimeout;
+  request.maxRedirects = kMaxRedirects;
+  const std::string address = request.url;
+  log.debug("fetchStorebagWithName: Storebag Server URL: %s", address.c_str());
+  const bool conditional = lastModified != nullptr && lastModified->has_value();
+  if (conditional) {
+    log.debug("fetchStorebagWithName: Adding 'Last-Modified: %s' to the header", (*lastModified)->c_str());
+    request.headers.emplace_back("If-Modified-Since", (*lastModified)->str());
+  }
+
+  const Reply reply = sendSynchronousRequest(std::move(request));
+  if (reply.error || !reply.response) {
+    log.normal(
+        "fetchStorebagWithName: Error resolving with lookup server %s, sendSynchronousRequest error %s",
+        address.c_str(), reply.error ? reply.error->localizedDescription.c_str() : "(null)");
+    if (!name || *name != kFallbackStorebagName) return std::nullopt;
+    log.normal("fetchStorebagWithName: Loading default storebag '%s'", name->c_str());
+    return fallbackStorebag();
+  }
+
+  maxAge = maxAgeFromCacheControl(reply.response->header("Cache-Control"));
+  const std::optional<std::string_view> modified = reply.response->header("Last-Modified");
+  if (lastModified != nullptr && modified) {
+    if (conditional && (!reply.data || reply.data->empty())) {
+      log.debug("fetchStorebagWithName: storebag content has not changed. using its cached version");
+      notModified = true;
+      return std::nullopt;
+    }
+    *lastModified = String(*modified);
+    log.debug("fetchStorebagWithName: New 'Last-Modified: %s' received", (*lastModified)->c_str());
+  }
+  return verifiedBag(reply);
+}
+
+std::optional<Dictionary> StorebagFetcher::verifiedBag(const Reply& reply) {
+  Log& log = configuration_.platform.log;
+  PropertyLists& propertyLists = configuration_.platform.propertyLists;
+  std::variant<Value, Error> document =
+      propertyLists.parse(reply.data ? reply.data->view() : std::string_view());
+  if (const Error* error = std::get_if<Error>(&document))
+    log.error("fetchStorebagWithName: propertyListWithData error %s", error->localizedDescription.c_str());
+  const Value* root = std::get_if<Value>(&document);
+  const Dictionary* dictionary = root != nullptr ? root->dictionary() : nullptr;
+  if (dictionary == nullptr || stringEntry(*dictionary, "signature") == nullptr) {
+    log.error("fetchStorebagWithName: Signature is missing");
+    return std::nullopt;
+  }
+
+  const std::optional<Data> der = configuration_.platform.clientBundle.resource("publicKey", "der");
+  const std::unique_ptr<PublicKey> key =
+      der ? configuration_.platform.cryptography.publicKeyFromDER(der->bytes()) : nullptr;
+  if (key == nullptr) return std::nullopt;
+  const std::optional<Data> signature = decodedEntry(*dictionary, "signature");
+  const std::optional<Data> bag = decodedEntry(*dictionary, "bag");
+  if (!signature || !bag) return std::nullopt;
+  if (!key->verifySHA1(configuration_.platform.cryptography.sha1(bag->bytes()), signature->bytes())) {
+    log.error("fetchStorebagWithName: Signature can not be verified, %p",
+              static_cast<const void*>(key.get()));
+    return std::nullopt;
+  }
+
+  std::variant<Value, Error> content = propertyLists.parse(bag->view());
+  const Value* contentRoot = std::get_if<Value>(&content);
+  if (contentRoot == nullptr || !contentRoot->isDictionary()) return std::nullopt;
+  return *contentRoot->dictionary();
+}
+
+std::optional<Dictionary> StorebagFetcher::fetchStorebagForEnvironmentAndClientType(
+    int32_t clientType, int32_t& maxAge, std::optional<String>& version, bool& notModified,
+    std::optional<String>* lastModified) {
+  Log& log = configuration_.platform.log;
+  const std::optional<String> name = storebagNameForClientType(clientType);
+  if (clientType == 0) {
+    log.error("fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type %d",
+              clientType);
+    return std::nullopt;
+  }
+  const std::optional<Dictionary> bag = fetchStorebagWithName(name, maxAge, notModified, lastModified);
+  if (!bag) {
+    if (!notModified) {
+      log.error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type %d",
+                clientType);
+    }
+    return std::nullopt;
+  }
+
+  const uint32_t environment = configuration_.environment.userDefaultsEnvironment();
+  const std::optional<String> sectionName = environmentName(environment);
+  const Dictionary* section = sectionEntry(*bag, sectionName);
+  if (section == nullptr && environment == kEnvironmentSeed) {
+    log.error("fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.");
+    section = sectionEntry(*bag, environmentName(kEnvironmentRelease));
+  }
+  if (section == nullptr) {
+    log.error(
+        "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type %d with %s environment",
+        clientType, sectionName ? sectionName->c_str() : "(null)");
+    return std::nullopt;
+  }
+
+  // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
+  const String* bagVersion = stringEntry(*bag, "version");
+  if (bagVersion == nullptr) return std::nullopt;
+  version = *bagVersion;
+  if (const Value* refreshCycle = bag->find("refresh_cycle")) {
+    maxAge = std::min(refreshCycle->intValue(), kMaxStorebagAge);
+    log.normal("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=%d", maxAge);
+  }
+  return *section;
+}
+
+StorebagFetcher::Reply StorebagFetcher::sendSynchronousRequest(URLRequest request) {
+  // Shared, because the completion may still be leaving signal() when wait() has returned.
+  struct Wait {
+    Semaphore done;
+    Reply reply;
+  };
+  auto wait = std::make_shared<Wait>();
+  {
+    MutexLock lock(mutex_);
+    if (cancelled_) {
+      wait->reply.error = Error{kKYTURLErrorDomain, kURLErrorCancelled, "cancelled"};
+      return std::move(wait->reply);
+    }
+    task_ = urlSession().start(
+        std::move(request),
+        [wait](std::optional<Data> data, std::optional<URLResponse> response, std::optional<Error> error) {
+          wait->reply = Reply{std::move(data), std::move(response), std::move(error)};
+          wait->done.signal();
+        });
+  }
+  wait->done.wait();
+  MutexLock lock(mutex_);
+  task_.reset();
+  return std::move(wait->reply);
+}
+
+URLSession& StorebagFetcher::urlSession() {
+  MutexLock lock(backendClassLock_);
+  if (urlSession_ == nullptr) {
+    URLSessionConfiguration configuration;
+    configuration.sourceApplication = kSourceApplication;
+    urlSession_ = configuration_.platform.urlSessions.create(std::move(configuration));
+  }
+  return *urlSession_;
+}
+
+void StorebagFetcher::cancel() {
+  std::shared_ptr<URLTask> task;
+  {
+    MutexLock lock(mutex_);
+    cancelled_ = true;
+    task = task_;
+  }
+  if (task != nullptr) task->cancel();
+}
+
+}  // namespace kyt

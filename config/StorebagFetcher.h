@@ -1,0 +1,66 @@
+// Downloads and verifies storebags: the signed property lists in which a server says which back ends the
+// sessions of a family of clients get. The agent is the only caller; it keeps what comes back
+// (daemon/ReportingdAgent.h) and makes its calls under its monitor, so that several sessions that need the
+// same bag download it once.
+//
+// A fetch blocks its thread until the reply is there, at most 15 seconds. The requests of the whole process
+// go through one URL session, made at first use while holding the lock of the class KYTReportingBackend,
+// which the composition root owns. Every failure is an absent result and one log line at most; nothing here
+// is fatal.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+
+#include "config/Configuration.h"
+#include "platform/Mutex.h"
+#include "platform/UrlSession.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+// No reply, however it asks, is kept longer than a day.
+inline constexpr int32_t kMaxStorebagAge = 86400;  // seconds
+
+class StorebagFetcher {
+ public:
+  StorebagFetcher(Configuration configuration, Mutex& backendClassLock);
+  StorebagFetcher(const StorebagFetcher&) = delete;
+  StorebagFetcher& operator=(const StorebagFetcher&) = delete;
+
+  // One download and verification. The whole bag, or none. `maxAge` (seconds) is written as soon as a reply
+  // came; `notModified` is set when the server said that the bag behind `lastModified` still holds.
+  // `lastModified` (not null) is sent when it has a value and replaced by what the reply says.
+  [[nodiscard]] std::optional<Dictionary> fetchStorebagWithName(const std::optional<String>& name,
+                                                                int32_t& maxAge, bool& notModified,
+                                                                std::optional<String>* lastModified);
+
+  // The section for the environment in force, and the bag's version.
+  [[nodiscard]] std::optional<Dictionary> fetchStorebagForEnvironmentAndClientType(
+      int32_t clientType, int32_t& maxAge, std::optional<String>& version, bool& notModified,
+      std::optional<String>* lastModified);
+
+  // Shut-down: a download under way ends with an error, later ones do not start. Any thread, never blocks.
+  void cancel();
+
+ private:
+  struct Reply {
+    std::optional<Data> data;
+    std::optional<URLResponse> response;
+    std::optional<Error> error;
+  };
+
+  Reply sendSynchronousRequest(URLRequest request);
+  URLSession& urlSession() REQUIRES(mutex_);
+  std::optional<Dictionary> verifiedBag(const Reply& reply);
+
+  Configuration configuration_;
+  Mutex& backendClassLock_;
+  Mutex mutex_;
+  std::unique_ptr<URLSession> urlSession_ GUARDED_BY(mutex_);
+  std::shared_ptr<URLTask> task_ GUARDED_BY(mutex_);
+  bool cancelled_ GUARDED_BY(mutex_) = false;
+};
+
+}  // namespace kyt
