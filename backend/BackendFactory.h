@@ -1,12 +1,16 @@
 // Turns the storebag's back-end table for one client type into live, configured back ends for one session.
+// Sessions know the interface; the composition root builds the one DefaultBackendFactory from the list of the
+// classes that there are (backends/BackendTable.h), so that this folder names none of them.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <utility>
 #include <vector>
 
 #include "backend/KYTReportingBackend.h"
+#include "config/Configuration.h"
 
 namespace kyt {
 
@@ -35,16 +39,45 @@ class BackendFactory {
  public:
   virtual ~BackendFactory() = default;
   // The class that the name stands for, or null (unknown name, an initialiser that failed).
-  [[nodiscard]] virtual std::shared_ptr<KYTReportingBackend> newBackendWithName(const String& name,
-                                                                                const Dictionary& profile,
-                                                                                std::optional<String> productFamily,
-                                                                                int32_t clientType) = 0;
-  // None when the table or the session information is missing; may be empty. `udid` is borrowed for the back ends'
-  // life.
+  [[nodiscard]] virtual std::shared_ptr<KYTReportingBackend> newBackendWithName(
+      const String& name, const Dictionary& profile, std::optional<String> productFamily,
+      int32_t clientType) = 0;
+  // None when the table or the session information is missing; may be empty. `udid` is borrowed for the back
+  // ends' life.
   [[nodiscard]] virtual std::optional<Backends> createBackends(const std::optional<Dictionary>& table,
                                                                const std::optional<Dictionary>& sessionInfo,
                                                                const std::optional<Dictionary>& userInfo,
                                                                const char* udid) = 0;
+};
+
+// One row: a back end's name and how its class is made. Null when the initialiser fails.
+struct BackendCreator {
+  using Create = std::function<std::shared_ptr<KYTReportingBackend>(
+      const String& name, const Dictionary& profile, const std::optional<String>& productFamily,
+      int32_t clientType)>;
+  String name;
+  Create create;
+};
+
+// Any thread; the creators are called on the caller's.
+class DefaultBackendFactory final : public BackendFactory {
+ public:
+  // Names are compared in the order of `creators`; the first equal one decides.
+  DefaultBackendFactory(Configuration& configuration, std::vector<BackendCreator> creators);
+
+  [[nodiscard]] std::shared_ptr<KYTReportingBackend> newBackendWithName(const String& name,
+                                                                        const Dictionary& profile,
+                                                                        std::optional<String> productFamily,
+                                                                        int32_t clientType) override;
+  [[nodiscard]] std::optional<Backends> createBackends(const std::optional<Dictionary>& table,
+                                                       const std::optional<Dictionary>& sessionInfo,
+                                                       const std::optional<Dictionary>& userInfo,
+                                                       const char* udid) override;
+
+ private:
+  [[nodiscard]] bool isExcludedOnThisDevice(const String& name) const;
+  Configuration configuration_;
+  const std::vector<BackendCreator> creators_;
 };
 
 }  // namespace kyt

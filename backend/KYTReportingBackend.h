@@ -1,16 +1,21 @@
-// The common base and the interface of all back ends: the objects to which a reporting session hands its clients'
-// events, files and log data. Created only by the factory (backend/BackendFactory.h), owned by one session in a
-// dictionary keyed by name; `cleanup` is called before the last reference goes. shared_ptr, because replies that arrive
-// on a URL session's queue hold their back end weakly.
+// The common base and the interface of all back ends: the objects to which a reporting session hands its
+// clients' events, files and log data. Created only by the factory (backend/BackendFactory.h), owned by one
+// session in a dictionary keyed by name; `cleanup` is called before the last reference goes. shared_ptr,
+// because replies that arrive on a URL session's queue hold their back end weakly.
 //
-// Threads: called on the owning session's queue; `state` and what a subclass says so are kept by the private state
-// queue. The other fields are set once, before the back end is used.
+// Threads: called on the owning session's queue; `state`, the sampling threshold and the combined session ID,
+// which other sessions of a hierarchy change, and what a subclass says so are kept by the private state
+// queue. The other fields are set once, before the back end is used. Code that runs on the state queue uses
+// the raw fields. Work that is handed to the state queue holds no reference, so a subclass whose work touches
+// its own fields calls drainStateQueue() in its destructor.
 #pragma once
 
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <utility>
 
 #include "backend/ReportingSessionConnectivityInterface.h"
 #include "platform/Clock.h"
@@ -47,12 +52,17 @@ using FlushCompletion = Function<void(Value result, std::optional<Error> error)>
 
 class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBackend> {
  public:
+  // A back end that does nothing, as the base alone is one.
+  static std::shared_ptr<KYTReportingBackend> initWithName(Platform& platform, String name,
+                                                           Dictionary profile,
+                                                           std::optional<String> productFamily);
   KYTReportingBackend(const KYTReportingBackend&) = delete;
   KYTReportingBackend& operator=(const KYTReportingBackend&) = delete;
   virtual ~KYTReportingBackend();
 
-  // 64 lower-case hexadecimal digits of the SHA-256 of the text's UTF-8 bytes, of which only as many are hashed as the
-  // text has UTF-16 code units: for text outside ASCII a prefix, deliberately, since servers compare with such digests.
+  // 64 lower-case hexadecimal digits of the SHA-256 of the text's UTF-8 bytes, of which only as many are
+  // hashed as the text has UTF-16 code units: for text outside ASCII a prefix, deliberately, since servers
+  // compare with such digests.
   [[nodiscard]] String convertIntoSHA256(const String& text) const;
 
   virtual void cleanup();
@@ -60,24 +70,26 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
   void setSelfVersion(const String& version);
 
-  // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued before it.
+  // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
+  // before it.
   [[nodiscard]] int32_t state() const;
   void setState(int32_t state);
   virtual void updateState();
 
   // The operation that every event goes through. The returned text goes into the local message log.
-  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
-                            EventID eventID, MessageFlag flag);
+  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+                            uint16_t respCode, EventID eventID, MessageFlag flag);
   // An operation of its own: back ends that implement only this one are not reached by routed events.
-  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
-                            EventID eventID);
+  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+                            uint16_t respCode, EventID eventID);
   // Numbers the event (1 for the first, 0 after 65535) and passes it to the six-argument operation.
   Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     MessageFlag flag);
 
   void setStartTimestamp(const TimeValue& timestamp);
   virtual Value flushMessagesWithCompletion(FlushCompletion completion);
-  // `extension` names the descriptors that came with the token; the back end that accepts takes them from there.
+  // `extension` names the descriptors that came with the token; the back end that accepts takes them from
+  // there.
   [[nodiscard]] virtual bool uploadFileAtPath(const String& path, const String& extensionToken,
                                               std::optional<FileExtension>& extension);
   [[nodiscard]] virtual bool uploadLogData(const Value& logData);
@@ -92,8 +104,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] const Dictionary& profile() const { return profile_; }
   [[nodiscard]] uint32_t sessionID() const { return sessionID_; }
   void setSessionID(uint32_t value) { sessionID_ = value; }
-  [[nodiscard]] const std::optional<String>& combinedSessionIDString() const { return combinedSessionIDString_; }
-  void setCombinedSessionIDString(std::optional<String> value) { combinedSessionIDString_ = std::move(value); }
+  // Read and written synchronously on the state queue: the agent sets it from another session's thread.
+  [[nodiscard]] std::optional<String> combinedSessionIDString() const;
+  void setCombinedSessionIDString(std::optional<String> value);
   [[nodiscard]] int32_t compType() const { return compType_; }
   void setCompType(int32_t value) { compType_ = value; }
   [[nodiscard]] uint16_t clientVersion() const { return clientVersion_; }
@@ -120,8 +133,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   void setBatchEvents(bool value) { batchEvents_ = value; }
   [[nodiscard]] double samplingFactor() const { return samplingFactor_; }
   void setSamplingFactor(double value) { samplingFactor_ = value; }
-  [[nodiscard]] const Value& samplingThreshold() const { return samplingThreshold_; }  // a number, or null
-  void setSamplingThreshold(Value value) { samplingThreshold_ = std::move(value); }
+  // A number, or null. On the state queue like the combined session ID: children copy their parent's.
+  [[nodiscard]] Value samplingThreshold() const;
+  void setSamplingThreshold(Value value);
   [[nodiscard]] const std::optional<Data>& digestKey() const { return digestKey_; }
   void setDigestKey(std::optional<Data> value) { digestKey_ = std::move(value); }
   [[nodiscard]] int32_t digestAlgorithm() const { return digestAlgorithm_; }
@@ -132,13 +146,21 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] uint8_t selfVersionMinor() const { return selfVersionMinor_; }
 
  protected:
-  // Subclasses are made through a static initWithName(...) that answers null on failure; it calls this constructor.
-  // Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
-  KYTReportingBackend(Platform& platform, String name, Dictionary profile, std::optional<String> productFamily);
+  // Subclasses are made through a static initWithName(...) that answers null on failure; it calls this
+  // constructor. Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
+  KYTReportingBackend(Platform& platform, String name, Dictionary profile,
+                      std::optional<String> productFamily);
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> connectivityDelegate() const {
     return reportingSessionConnectivityDelegate_.lock();
   }
   [[nodiscard]] SerialQueue& stateQueue() const { return *stateQueue_; }
+  // Runs what was handed to the state queue and has not begun.
+  void drainStateQueue();
+  // A random identifier that stays the same on this device, created on first use: one for reports that
+  // respect the user's consent, one for those that override it.
+  [[nodiscard]] String getPersistentIdentifierForDNU(bool respectDnu);
+  // What is stored in the daemon's user defaults under the key; otherwise a new random UUID, then stored.
+  [[nodiscard]] String persistentIdentifier(std::string_view key);
 
   Platform& platform_;
   String name_;
@@ -147,7 +169,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::optional<String> productVersion_, buildVersion_, hardwareType_, productFamily_;
   double startTimeStamp_ = 0;  // seconds since 1970
   uint32_t sessionID_ = 0;
-  std::optional<String> combinedSessionIDString_;
+  std::optional<String> combinedSessionIDString_;  // touched on the state queue only
   int32_t compType_ = 0;
   uint16_t clientVersion_ = 0;
   uint16_t eventID_ = 0;
@@ -160,7 +182,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   const char* udid_ = "";
   std::optional<String> displayURL_;
   double samplingFactor_ = 0;
-  Value samplingThreshold_;
+  Value samplingThreshold_;  // touched on the state queue only
   std::shared_ptr<SerialQueue> stateQueue_;
   std::optional<Array> eventWhitelist_, eventBlacklist_;
   std::optional<Data> digestKey_;

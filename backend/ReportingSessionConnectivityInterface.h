@@ -8,8 +8,8 @@ namespace kyt {
 class ReportingSessionConnectivityInterface {
  public:
   virtual ~ReportingSessionConnectivityInterface() = default;
-  // The caller sets method, headers and body. The completion may be empty; it runs on the URL session's own queue with
-  // (data, response, error), unchanged. Any thread, never blocks.
+  // The caller sets method, headers and body. The completion may be empty; it runs on the URL session's own
+  // queue with (data, response, error), unchanged. Any thread, never blocks.
   virtual void postURLRequestWithCompletionHandler(URLRequest request, URLCompletion completion) = 0;
 };
 

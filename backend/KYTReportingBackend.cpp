@@ -1,0 +1,162 @@
+#include "backend/KYTReportingBackend.h"
+
+#include <algorithm>
+#include <vector>
+
+#include "backend/Text.h"
+#include "platform/Cryptography.h"
+#include "platform/Platform.h"
+#include "platform/SerialQueue.h"
+#include "platform/System.h"
+#include "platform/UserDefaults.h"
+
+namespace kyt {
+
+namespace {
+
+bool holdsCategory(const Array& list, uint16_t category) {
+  return std::any_of(list.begin(), list.end(),
+                     [category](const Value& entry) { return entry.intValue() == category; });
+}
+
+}  // namespace
+
+std::shared_ptr<KYTReportingBackend> KYTReportingBackend::initWithName(Platform& platform, String name,
+                                                                       Dictionary profile,
+                                                                       std::optional<String> productFamily) {
+  struct Plain final : KYTReportingBackend {
+    Plain(Platform& p, String n, Dictionary d, std::optional<String> f)
+        : KYTReportingBackend(p, std::move(n), std::move(d), std::move(f)) {}
+  };
+  return std::make_shared<Plain>(platform, std::move(name), std::move(profile), std::move(productFamily));
+}
+
+KYTReportingBackend::KYTReportingBackend(Platform& platform, String name, Dictionary profile,
+                                         std::optional<String> productFamily)
+    : platform_(platform),
+      name_(std::move(name)),
+      profile_(std::move(profile)),
+      productFamily_(std::move(productFamily)),
+      samplingFactor_(platform.random.uniform(101) / 100.0),
+      stateQueue_(SerialQueue::create("com.vantu.KYTReportingBackendStateQueue", platform.executor)) {}
+
+KYTReportingBackend::~KYTReportingBackend() {
+  drainStateQueue();
+}
+
+void KYTReportingBackend::drainStateQueue() {
+  stateQueue_->sync([] {});
+}
+
+String KYTReportingBackend::convertIntoSHA256(const String& text) const {
+  const Bytes bytes = std::as_bytes(std::span(text.view()));
+  const auto digest = platform_.cryptography.sha256(bytes.first(std::min(text.utf16Length(), bytes.size())));
+  std::string hex;
+  hex.reserve(2 * digest.size());
+  appendHex(digest, hex);
+  return String(hex);
+}
+
+void KYTReportingBackend::cleanup() {}
+
+void KYTReportingBackend::setReportingSessionConnectivityDelegate(
+    std::weak_ptr<ReportingSessionConnectivityInterface> delegate) {
+  reportingSessionConnectivityDelegate_ = std::move(delegate);
+}
+
+void KYTReportingBackend::setSelfVersion(const String& version) {
+  const std::array<uint8_t, 3> parts = versionParts(version);
+  selfVersionMajor_ = parts[0];
+  selfVersionMiddle_ = parts[1];
+  selfVersionMinor_ = parts[2];
+}
+
+int32_t KYTReportingBackend::state() const {
+  return stateQueue_->sync([this] { return state_; });
+}
+
+void KYTReportingBackend::setState(int32_t state) {
+  stateQueue_->async([this, state] { state_ = state; });
+}
+
+void KYTReportingBackend::updateState() {
+  setState(kBackendStateEnabled);
+}
+
+Value KYTReportingBackend::sendMessage(const Dictionary&, const TimeValue&, uint16_t, uint16_t, EventID,
+                                       MessageFlag) {
+  return {};
+}
+
+Value KYTReportingBackend::sendMessage(const Dictionary&, const TimeValue&, uint16_t, uint16_t, EventID) {
+  return {};
+}
+
+Value KYTReportingBackend::sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+                                       uint16_t respCode, MessageFlag flag) {
+  ++eventID_;
+  return sendMessage(message, timestamp, method, respCode, EventID{eventID_}, flag);
+}
+
+void KYTReportingBackend::setStartTimestamp(const TimeValue& timestamp) {
+  startTimeStamp_ = timestamp.asSeconds();
+}
+
+Value KYTReportingBackend::flushMessagesWithCompletion(FlushCompletion completion) {
+  if (completion) completion(Value(), std::nullopt);
+  return {};
+}
+
+bool KYTReportingBackend::uploadFileAtPath(const String&, const String&, std::optional<FileExtension>&) {
+  return false;
+}
+
+bool KYTReportingBackend::uploadLogData(const Value&) {
+  return false;
+}
+
+void KYTReportingBackend::setCorrelatedSessionID(const String& sessionID) {
+  setCombinedSessionIDString(sessionID);
+}
+
+bool KYTReportingBackend::isWhitelistedEvent(uint16_t category) const {
+  // Deliberately not the mirror image of the black list: an empty white list blocks every event.
+  return !eventWhitelist_ || holdsCategory(*eventWhitelist_, category);
+}
+
+bool KYTReportingBackend::isBlacklistedEvent(uint16_t category) const {
+  return eventBlacklist_ && holdsCategory(*eventBlacklist_, category);
+}
+
+uint64_t KYTReportingBackend::batchedEventsSize() const {
+  return 0;
+}
+
+std::optional<String> KYTReportingBackend::combinedSessionIDString() const {
+  return stateQueue_->sync([this] { return combinedSessionIDString_; });
+}
+
+void KYTReportingBackend::setCombinedSessionIDString(std::optional<String> value) {
+  stateQueue_->sync([&] { combinedSessionIDString_ = std::move(value); });
+}
+
+Value KYTReportingBackend::samplingThreshold() const {
+  return stateQueue_->sync([this] { return samplingThreshold_; });
+}
+
+void KYTReportingBackend::setSamplingThreshold(Value value) {
+  stateQueue_->sync([&] { samplingThreshold_ = std::move(value); });
+}
+
+String KYTReportingBackend::getPersistentIdentifierForDNU(bool respectDnu) {
+  return persistentIdentifier(respectDnu ? "uuidRespectDnu" : "uuidOverrideDnu");
+}
+
+String KYTReportingBackend::persistentIdentifier(std::string_view key) {
+  const Value stored = platform_.userDefaults.value(kKYTReportingDefaultsDomain, key);
+  if (const String* identifier = stored.string()) return *identifier;
+  return platform_.userDefaults.stringOrStore(kKYTReportingDefaultsDomain, key,
+                                              String(uuidText(platform_.random.uuidBytes())));
+}
+
+}  // namespace kyt
