@@ -1,10 +1,11 @@
-// A counting semaphore for the operations that block by design until a reply arrives. wait() announces itself to the
-// worker pool (BlockingScope). signal() may be called from any thread; it never blocks.
+// A counting semaphore for the operations that block by design until a reply arrives. wait() announces itself
+// to the worker pool (BlockingScope). signal() may be called from any thread; it never blocks. A semaphore
+// may be destroyed as soon as its last wait has returned, even while signal() is on its way out on another
+// thread.
 #pragma once
 
-#include <condition_variable>
-
 #include "platform/Clock.h"
+#include "platform/ConditionVariable.h"
 #include "platform/Mutex.h"
 
 namespace kyt {
@@ -18,8 +19,9 @@ class Semaphore {
   void signal();
 
  private:
+  [[nodiscard]] bool tryTake();
   Mutex mutex_;
-  std::condition_variable changed_;
+  ConditionVariable changed_;
   unsigned value_ GUARDED_BY(mutex_);
 };
 

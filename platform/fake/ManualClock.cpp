@@ -1,0 +1,35 @@
+#include "platform/fake/ManualClock.h"
+
+namespace kyt {
+
+TimeValue ManualClock::timeOfDay() const {
+  MutexLock lock(mutex_);
+  return timeOfDay_;
+}
+
+MonotonicTime ManualClock::monotonic() const {
+  MutexLock lock(mutex_);
+  return monotonic_;
+}
+
+void ManualClock::setTimeOfDay(TimeValue value) {
+  MutexLock lock(mutex_);
+  timeOfDay_ = value;
+}
+
+void ManualClock::setMonotonic(MonotonicTime value) {
+  MutexLock lock(mutex_);
+  monotonic_ = value;
+}
+
+void ManualClock::advance(Duration duration) {
+  using namespace std::chrono;
+  MutexLock lock(mutex_);
+  monotonic_ += duration;
+  const microseconds day = seconds(timeOfDay_.seconds) + microseconds(timeOfDay_.microseconds) +
+                           duration_cast<microseconds>(duration);
+  const seconds whole = floor<seconds>(day);
+  timeOfDay_ = {whole.count(), static_cast<int32_t>((day - whole).count())};
+}
+
+}  // namespace kyt
