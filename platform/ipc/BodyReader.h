@@ -27,8 +27,15 @@ namespace kyt {
 
 enum class BodyStatus : uint8_t { ok, invalidArguments, malformed };
 
-// Checks a whole body against its own signature, without making objects: ok or malformed.
-[[nodiscard]] BodyStatus validateBody(const Message& message);
+// Where reading stands; the representation of BodyReader.
+struct WireCursor {
+  const uint8_t* begin;
+  const uint8_t* at;
+  const uint8_t* end;
+  bool swapped;
+  BodyStatus status = BodyStatus::ok;
+  const char* problem = nullptr;
+};
 
 class BodyReader {
  public:
@@ -56,33 +63,14 @@ class BodyReader {
   // Everything was read, and nothing is left over. Otherwise whose fault it is.
   [[nodiscard]] BodyStatus finish();
   // After a status other than ok: what was wrong, for the error reply and the log.
-  [[nodiscard]] const char* problem() const { return problem_; }
+  [[nodiscard]] const char* problem() const { return cursor_.problem; }
 
  private:
-  bool align(size_t alignment);
-  bool malformed(const char* problem);
-  bool invalid(const char* problem);
-  bool read16(uint16_t& out);
-  bool read32(uint32_t& out);
-  bool read64(uint64_t& out);
-  bool readText(std::string_view& out);
-  bool readSignature(std::string_view& out);
-  bool readArrayBounds(size_t elementAlignment, const uint8_t*& end);
-  bool readVariant(Value& out, int depth);
-  bool readValue(std::string_view type, Value& out, int depth);
-  bool readContainer(std::string_view type, Value& out, int depth);
-  bool readEntries(std::string_view valueType, Dictionary& out, int depth);
-  bool readElements(std::string_view elementType, Array& out, int depth);
-  bool readBytes(Data& out);
-  bool endOfArray(const uint8_t* end);
+  [[nodiscard]] bool good() const { return cursor_.status == BodyStatus::ok; }
+  bool endOfOptional(const uint8_t* end);
 
   const Message& message_;
-  const uint8_t* begin_;
-  const uint8_t* at_;
-  const uint8_t* end_;
-  bool swapped_;
-  BodyStatus status_ = BodyStatus::ok;
-  const char* problem_ = nullptr;
+  WireCursor cursor_;
 };
 
 }  // namespace kyt

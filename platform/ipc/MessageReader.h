@@ -4,7 +4,7 @@
 // Pure: no allocation, no state between calls, any thread. The bytes are hostile; a message is looked at in
 // place, at any address, in either byte order. Everything in the header is checked: field types and padding,
 // required fields, names, paths, signatures, lengths against the limit before anything else is believed. The
-// body is checked by BodyReader or validateBody.
+// body is checked by BodyReader, or by validateBody.
 #pragma once
 
 #include <cstddef>
