@@ -1,5 +1,5 @@
-// All that a session knows of the agent. The agent is also the lock object for shared-data and hierarchy calls: the
-// operations that say so are called while holding `monitor()`.
+// All that a session knows of the agent. The agent is also the lock object for shared-data and hierarchy
+// calls: the operations that say so are called while holding `monitor()`.
 #pragma once
 
 #include <memory>
@@ -27,7 +27,8 @@ class ReportingdSessionDelegate {
   [[nodiscard]] virtual std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(
       ReportingdSession& session) = 0;
   virtual void updateDownstreamSessions(ReportingdSession& session) = 0;
-  [[nodiscard]] virtual std::shared_ptr<ReportingdSession> parentSessionForChild(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::shared_ptr<ReportingdSession> parentSessionForChild(
+      ReportingdSession& session) = 0;
   virtual void updateSharedDataForSession(ReportingdSession& session, const Dictionary& sharedData) = 0;
   virtual void removeObjectFromSharedDataForSession(ReportingdSession& session, const String& key) = 0;
   [[nodiscard]] virtual std::optional<Dictionary> sharedDataForSession(ReportingdSession& session) = 0;

@@ -1,0 +1,264 @@
+// The life of a session: made, identified, configured, re-configured by new user information, ended.
+#include "session/ReportingdSession.h"
+
+#include <cassert>
+#include <utility>
+
+#include "platform/DeviceProperties.h"
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/System.h"
+#include "platform/UserDefaults.h"
+#include "session/ReportingSessionConnectivityHelper.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr uint16_t kInternalMethod = 0;
+constexpr uint16_t kStartMessage = 0;
+constexpr uint16_t kStopMessage = 1;
+
+const String* stringEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->string() : nullptr;
+}
+
+// A missing value on the new side never equals, not even a missing one.
+bool isSameName(const std::optional<Dictionary>& newInfo, const Dictionary& oldInfo, const char* key) {
+  const String* newName = newInfo ? stringEntry(*newInfo, key) : nullptr;
+  const String* oldName = stringEntry(oldInfo, key);
+  return newName != nullptr && oldName != nullptr && *newName == *oldName;
+}
+
+}  // namespace
+
+std::shared_ptr<ReportingdSession> ReportingdSession::initWithSessionDelegate(
+    ReportingdSessionDelegate& delegate, std::shared_ptr<Connection> connection,
+    ReportingdSessionClass& sessionClass) {
+  return std::shared_ptr<ReportingdSession>(
+      new ReportingdSession(delegate, std::move(connection), sessionClass));
+}
+
+ReportingdSession::ReportingdSession(ReportingdSessionDelegate& delegate,
+                                     std::shared_ptr<Connection> connection,
+                                     ReportingdSessionClass& sessionClass)
+    : class_(sessionClass),
+      _sessionDelegate(delegate),
+      peerUser_(connection->peerUser()),
+      _connection(std::move(connection)) {
+  log().debug("initWithSessionDelegate: ReportingdSession initWithSessionDelegate:%s",
+              delegate.description().c_str());
+  class_.deviceIdentity().deviceUniqueIDCString(_deviceid.data(), kDeviceIDSize);
+  _sessionIDString = base64(platform().random.uuidBytes());
+  _connectivityHelper = ReportingSessionConnectivityHelper::init(platform().urlSessions);
+  log().debug("initWithSessionDelegate: Initialized session with UUID %s", _sessionIDString.c_str());
+}
+
+ReportingdSession::~ReportingdSession() = default;
+
+Log& ReportingdSession::log() const {
+  return platform().log;
+}
+
+std::string ReportingdSession::description() const {
+  return formatObjects("<ReportingdSession %@>", {_sessionIDString});
+}
+
+bool ReportingdSession::requiresUserInfo() const {
+  const Value* required =
+      _sessionInfo ? _sessionInfo->find(kKYTReportingSessionInfoRequireUserInfo) : nullptr;
+  return required != nullptr && required->boolValue();
+}
+
+// Under one hold of the monitor, so that no other session finds the new level under the old registration.
+void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
+  const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
+  const Value* token = sessionInfo.find(kKYTReportingSessionInfoHierarchyToken);
+  MonitorLock lock(_sessionDelegate.monitor());
+  _sessionID = sessionID != nullptr ? sessionID->unsignedIntValue() : 0;
+  _sessionInfo = sessionInfo;
+  _hierarchyDictionary.reset();
+  if (token != nullptr && token->isDictionary()) _hierarchyDictionary = *token->dictionary();
+  _sessionDelegate.updateCorrelatedSessions(*this);
+}
+
+void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
+                                       Value frameworksToCheck, bool hasAggregationBlock) {
+  const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
+  log().debug("setSessionInfo: Configuring session %u",
+              sessionID != nullptr ? sessionID->unsignedIntValue() : 0);
+  const Value* required = sessionInfo.find(kKYTReportingSessionInfoRequireUserInfo);
+  if (userInfo && (required == nullptr || !required->boolValue()))
+    log().error("setSessionInfo: Configure session: user info provided without requiring it");
+  takeOverIdentity(sessionInfo);
+  _frameworks = std::move(frameworksToCheck);
+  _userInfo = std::move(userInfo);
+  MonitorLock lock(_sessionDelegate.monitor());
+  setHasAggregator(hasAggregationBlock);
+}
+
+void ReportingdSession::startConfigWithCompletionHandler(StatesReply reply) {
+  log().debug("startConfigWithCompletionHandler: Starting configuration for session %u", _sessionID);
+  const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
+  if (!storebag) {
+    if (reply) reply(std::nullopt);
+    return;
+  }
+  _storebagVersion = _sessionDelegate.storebagVersionForSession(*this);
+  createBackendsWithStorebag(*storebag);
+  updateSessionWithDefaultSessionInfo();
+  sendStartMessage();
+  if (reply) reply(fetchReportingStates());
+}
+
+void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
+  log().debug("createBackendsWithStorebag: Creating backends for session %u", _sessionID);
+  Backends backends = class_.backendFactory()
+                          .createBackends(storebag, _sessionInfo, _userInfo, _deviceid.data())
+                          .value_or(Backends());
+  for (const auto& [key, backend] : backends) {
+    backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
+    backend->setCombinedSessionIDString(_sessionIDString);
+  }
+  // What back ends of an earlier configuration hold in batches would be lost with them.
+  if (hasBackends()) internalFlushMessagesWithCompletion(nullptr);
+  {
+    MonitorLock lock(_sessionDelegate.monitor());
+    std::swap(_backends, backends);
+  }
+  for (const auto& [key, backend] : backends) backend->cleanup();
+}
+
+void ReportingdSession::updateSessionWithDefaultSessionInfo() {
+  updateReportingStates();
+  _sessionDelegate.updateDownstreamSessions(*this);
+}
+
+void ReportingdSession::sendStartMessage() {
+  const TimeValue timestamp = platform().clock.timeOfDay();
+  DeviceIdentity& device = class_.deviceIdentity();
+  const String unknown("Unknown");
+  // Asked of the device on every build, although only an internal one tells them.
+  const String productVersion = device.productVersion().value_or(unknown);
+  const String buildVersion = device.buildVersion().value_or(unknown);
+  const String deviceName = device.deviceName().value_or(unknown);
+  const String serialNumber = device.serialNumber().value_or(unknown);
+  const String hardwareModel = device.hardwareModel().value_or(unknown);
+  const String countryCode = platform().deviceProperties.countryCode().value_or(unknown);
+  const String reportVersion = platform().clientBundle.version().value_or("8.0");
+  const Value automaticTime =
+      platform().userDefaults.value(kTimedDefaultsDomain, "TMAutomaticTimeZoneEnabled");
+  const bool automaticTimeSet = automaticTime.isNull() || automaticTime.boolValue();
+
+  Dictionary payload;
+  if (device.isInternalBuild()) {
+    payload = Dictionary{{"SerialNum", serialNumber}, {"Version", productVersion},
+                         {"Build", buildVersion},     {"Hardware", hardwareModel},
+                         {"Product", deviceName},     {"ReportVers", reportVersion},
+                         {"Locale", countryCode},     {"AutomaticTimeSet", automaticTimeSet}};
+  } else {
+    payload = Dictionary{{"AutomaticTimeSet", automaticTimeSet}, {"Locale", countryCode}};
+  }
+  internalSendMessage(std::move(payload), timestamp, kInternalMethod, kStartMessage);
+}
+
+void ReportingdSession::fetchStatesWithUserInfo(std::optional<Dictionary> userInfo, StatesReply reply) {
+  log().debug("fetchStatesWithUserInfo: Fetching states for session %u", _sessionID);
+  receivedUserInfo(userInfo);
+  if (reply) reply(fetchReportingStates());
+}
+
+void ReportingdSession::receivedUserInfo(const std::optional<Dictionary>& userInfo) {
+  bool changed = true;
+  if (_userInfo) {
+    if (!userInfo && requiresUserInfo()) return;
+    changed = !isSameName(userInfo, *_userInfo, kKYTReportingUserInfoClientName) ||
+              !isSameName(userInfo, *_userInfo, kKYTReportingUserInfoServiceName);
+  } else if (!userInfo) {
+    return;
+  }
+  _userInfo = userInfo;
+  updateUserInfoForBackends();
+  if (!changed) return;
+  log().debug("receivedUserInfo: Received new user info for session %u", _sessionID);
+  updateSessionWithDefaultSessionInfo();
+}
+
+void ReportingdSession::updateUserInfoForBackends() {
+  for (const auto& [key, backend] : _backends) {
+    backend->setUserInfoDict(_userInfo);
+    if (key != kKYTReportingBackendQRS) continue;
+    backend->setDigestKey(_digestKey);
+    backend->setDigestAlgorithm(_digestAlgorithm);
+  }
+}
+
+// The algorithm's number is deliberately not kept: the next user information hands the back end the kept key
+// with the algorithm 0, and servers that expect that would refuse digests of another.
+void ReportingdSession::setDigestKey(Data key, int32_t algorithm) {
+  _digestKey = std::move(key);
+  KYTReportingBackend* backend = _backends.find(kKYTReportingBackendQRS);
+  if (backend == nullptr) return;
+  backend->setDigestKey(_digestKey);
+  backend->setDigestAlgorithm(algorithm);
+}
+
+void ReportingdSession::fetchDisplayURL(StringReply reply) {
+  log().debug("fetchDisplayURL: Fetching display URL for session %u", _sessionID);
+  KYTReportingBackend* candidate = _backends.find(kKYTReportingBackendHTTPPost);
+  if (candidate == nullptr || !candidate->displayURL())
+    candidate = _backends.find(kKYTReportingBackendHTTPPost2);
+  if (candidate == nullptr || !candidate->displayURL())
+    candidate = _backends.find(kKYTReportingBackendDashboard);
+  if (!reply) return;
+  reply(candidate != nullptr && candidate->displayURL() ? *candidate->displayURL()
+                                                        : String("URL not available"));
+}
+
+void ReportingdSession::finishSessionGracefully() {
+  _hasFinishedGracefully = true;
+  log().debug("finishSessionGracefully: Session %u has been finished gracefully", _sessionID);
+}
+
+void ReportingdSession::dealloc() {
+  assert(!ended_);
+  ended_ = true;
+  log().debug("dealloc: ReportingdSession dealloc: %u", _sessionID);
+  const TimeValue timestamp = platform().clock.timeOfDay();
+  Dictionary payload;
+  if (_storebagVersion) {
+    payload.set("StorebagVersion", *_storebagVersion);
+    payload.set("GracefulTermination", _hasFinishedGracefully);
+  }
+  {
+    MonitorLock lock(_sessionDelegate.monitor());
+    _sessionDelegate.addAgentHealthInfoForSession(*this, payload);
+  }
+  if (hasBackends()) {
+    internalSendMessage(std::move(payload), timestamp, kInternalMethod, kStopMessage);
+    flushMessagesWithCompletion(nullptr);
+  }
+  shutdownSessionAggregation();
+
+  Backends backends;
+  std::shared_ptr<Connection> connection;
+  {
+    MonitorLock lock(_sessionDelegate.monitor());
+    _sessionInfo.reset();
+    _hierarchyDictionary.reset();
+    std::swap(_backends, backends);
+    connection = std::move(_connection);
+  }
+  _userInfo.reset();
+  _frameworks = nullptr;
+  for (const auto& [key, backend] : backends) backend->cleanup();
+  _periodicServices = Dictionary();
+  _storebagVersion.reset();
+  _digestKey.reset();
+  // Requests that were started complete all the same.
+  _connectivityHelper.reset();
+}
+
+}  // namespace kyt

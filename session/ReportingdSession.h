@@ -1,0 +1,163 @@
+// The daemon's side of one reporting session that a client opened: it configures its back ends from the
+// storebag, decides which of them gets a message, fans flushes and uploads out to them, keeps their states in
+// step with its parent session, and reports its own start and end as internal messages. The agent makes one
+// for each accepted connection; the connection keeps it as its exported object until it is invalidated.
+//
+// Threads: the client's calls and dealloc() run on the connection's queue, one at a time. Sessions of one
+// hierarchy reach into each other while holding the agent's monitor. So fields of the first group below are
+// written only on the connection's queue while holding the monitor, are read there without it, and elsewhere
+// only while holding it; those of the second group are touched on the connection's queue alone.
+//
+// Defined in several files by subject: ReportingdSession.cpp (lifecycle and configuration), …_Routing.cpp
+// (the two doors for messages), …_Flush.cpp (flush, uploads, log data), …_States.cpp (states, hierarchy,
+// aggregation).
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "backend/BackendFactory.h"
+#include "config/DeviceIdentity.h"
+#include "platform/Clock.h"
+#include "platform/Value.h"
+#include "platform/ipc/ClientSessionInterface.h"
+#include "platform/ipc/Listener.h"
+#include "session/ReportingdSessionClass.h"
+#include "session/ReportingdSessionDelegate.h"
+
+namespace kyt {
+
+class ReportingSessionConnectivityHelper;
+
+class ReportingdSession final : public ClientSessionInterface {
+ public:
+  // Never fails. The delegate and the class outlive the session; the connection is held until dealloc().
+  [[nodiscard]] static std::shared_ptr<ReportingdSession> initWithSessionDelegate(
+      ReportingdSessionDelegate& delegate, std::shared_ptr<Connection> connection,
+      ReportingdSessionClass& sessionClass);
+  ~ReportingdSession() override;
+  ReportingdSession(const ReportingdSession&) = delete;
+  ReportingdSession& operator=(const ReportingdSession&) = delete;
+
+  // The end of the session: the stop message, the final flush, the end of aggregation, and the clean-up of
+  // its back ends. Exactly once, on the connection's queue after its invalidation, with no lock held and
+  // after the agent has taken the session out of its list.
+  void dealloc();
+
+  // What the client calls.
+  void setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo, Value frameworksToCheck,
+                      bool hasAggregationBlock) override;
+  void startConfigWithCompletionHandler(StatesReply reply) override;
+  void fetchStatesWithUserInfo(std::optional<Dictionary> userInfo, StatesReply reply) override;
+  void fetchDisplayURL(StringReply reply) override;
+  void sendMessageWithDictionary(Dictionary message, ObjectReply reply) override;
+  void flushMessagesWithCompletion(ResultReply completion) override;
+  void finishSessionGracefully() override;
+  void uploadFileAtPath(String fileURL, String extensionToken, std::optional<FileExtension> extension,
+                        SuccessReply completionHandler) override;
+  void uploadLogData(Value logData, SuccessErrorReply completionHandler) override;
+  void sendMessageWithSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
+                                  uint16_t category, uint16_t type, std::optional<Dictionary> payload,
+                                  StringReply reply) override;
+  void updateSharedDataWithDictionary(Dictionary sharedData) override;
+  void updateSharedDataForKey(String key, Value value) override;
+  void setDigestKey(Data key, int32_t algorithm) override;
+
+  // What the agent and other sessions of the hierarchy call, holding the agent's monitor.
+  void syncReportingStates();
+  void updateCombinedSessionID();
+  void sendToAggregator(const std::optional<Dictionary>& sessionInfo, double timestamp, uint16_t category,
+                        uint16_t type, const std::optional<Dictionary>& payload);
+  void shutdownSessionAggregation();
+  [[nodiscard]] uint64_t batchedEventsSize() const;
+  [[nodiscard]] uint32_t hierarchyLevel() const;
+  // The token's identifier. A text is itself; other kinds count by their description.
+  [[nodiscard]] std::optional<String> hierarchyToken() const;
+  // The agent refused the session's hierarchy token: it has none from now on.
+  void becomeStandalone();
+  [[nodiscard]] uint32_t sessionID() const { return _sessionID; }
+  void setSessionID(uint32_t sessionID) { _sessionID = sessionID; }
+  [[nodiscard]] const std::optional<Dictionary>& sessionInfo() const { return _sessionInfo; }
+  [[nodiscard]] bool hasAggregator() const { return _hasAggregator.load(std::memory_order_relaxed); }
+  void setHasAggregator(bool value) { _hasAggregator.store(value, std::memory_order_relaxed); }
+  [[nodiscard]] KYTReportingBackend* backendForKey(std::string_view key) const { return _backends.find(key); }
+
+  // On the connection's queue.
+  void updateReportingStates();
+  [[nodiscard]] std::optional<Array> fetchReportingStates() const;
+  [[nodiscard]] const std::optional<Dictionary>& userInfo() const { return _userInfo; }
+  [[nodiscard]] const std::optional<String>& storebagVersion() const { return _storebagVersion; }
+  void setStorebagVersion(std::optional<String> version) { _storebagVersion = std::move(version); }
+
+  // Any thread: constant.
+  [[nodiscard]] const String& sessionIDString() const { return _sessionIDString; }
+  [[nodiscard]] uint32_t peerUser() const { return peerUser_; }
+  [[nodiscard]] std::string description() const;
+
+ private:
+  ReportingdSession(ReportingdSessionDelegate& delegate, std::shared_ptr<Connection> connection,
+                    ReportingdSessionClass& sessionClass);
+
+  // Lifecycle and configuration.
+  void takeOverIdentity(const Dictionary& sessionInfo);
+  void createBackendsWithStorebag(const Dictionary& storebag);
+  void updateSessionWithDefaultSessionInfo();
+  void sendStartMessage();
+  void receivedUserInfo(const std::optional<Dictionary>& userInfo);
+  void updateUserInfoForBackends();
+  [[nodiscard]] bool requiresUserInfo() const;
+  // A table that yielded no back end counts as no back ends.
+  [[nodiscard]] bool hasBackends() const { return !_backends.empty(); }
+
+  // Routing.
+  Value sendMessageWithDictionaryError(const Dictionary& message);
+  void internalSendMessage(std::optional<Dictionary> payload, const TimeValue& timestamp, uint16_t method,
+                           uint16_t respCode);
+  [[nodiscard]] Dictionary envelopeWithPayload(const Dictionary* payload);
+  Value routeToBackends(const Dictionary& envelope, const TimeValue& timestamp, uint16_t category,
+                        uint16_t type, MessageFlag flag);
+
+  // Flush and uploads.
+  void internalFlushMessagesWithCompletion(ResultReply completion);
+  void uploadFileWithURL(const String& fileURL, const String& extensionToken,
+                         std::optional<FileExtension> extension, SuccessReply completionHandler);
+
+  // Aggregation.
+  void aggregateMessage(const std::optional<Dictionary>& sessionInfo, double timestamp, uint16_t category,
+                        uint16_t type, const Dictionary* payload);
+
+  [[nodiscard]] Platform& platform() const { return class_.platform(); }
+  [[nodiscard]] Log& log() const;
+
+  // Constant after construction.
+  ReportingdSessionClass& class_;
+  ReportingdSessionDelegate& _sessionDelegate;
+  String _sessionIDString;  // base64 of a random UUID
+  std::array<char, kDeviceIDSize> _deviceid{};
+  uint32_t peerUser_;
+
+  // Written on the connection's queue while holding the monitor.
+  uint32_t _sessionID = 0;
+  std::optional<Dictionary> _sessionInfo;
+  std::optional<Dictionary> _hierarchyDictionary;
+  Backends _backends;
+  std::shared_ptr<Connection> _connection;
+  std::atomic<bool> _hasAggregator{false};  // cleared by other sessions too, holding the monitor
+
+  // Touched on the connection's queue alone.
+  std::optional<Dictionary> _userInfo;
+  Value _frameworks;             // kept for the session's life; nothing here reads it
+  Dictionary _periodicServices;  // nothing here fills it
+  std::optional<String> _storebagVersion;
+  bool _hasFinishedGracefully = false;
+  std::optional<Data> _digestKey;
+  const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()
+  std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
+  bool ended_ = false;
+};
+
+}  // namespace kyt

@@ -1,0 +1,90 @@
+#include "session/ReportingdSessionClass.h"
+
+#include "backend/BackendFactory.h"
+#include "config/DeviceIdentity.h"
+#include "platform/Clock.h"
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "session/MessageLog.h"
+#include "session/ReportingSessionConnectivityHelper.h"
+
+namespace kyt {
+
+namespace {
+
+bool boolEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr && value->boolValue();
+}
+
+}  // namespace
+
+ReportingdSessionClass::ReportingdSessionClass(Configuration configuration, BackendFactory& backendFactory,
+                                               MessageLog& messageLog)
+    : configuration_(configuration), backendFactory_(backendFactory), messageLog_(messageLog) {}
+
+ReportingdSessionClass::~ReportingdSessionClass() = default;
+
+std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::singleMessageHelper() {
+  MutexLock lock(lock_);
+  if (singleMessageHelper_ == nullptr)
+    singleMessageHelper_ = ReportingSessionConnectivityHelper::init(platform().urlSessions);
+  return singleMessageHelper_;
+}
+
+// Deliberately unlike the session's own door: each back end works out its state first, gets the bare payload
+// without an envelope or shared data, with the serial number on internal builds, and always the flag 0;
+// nothing is aggregated.
+void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dictionary>& sessionInfo,
+                                                        const std::optional<Dictionary>& userInfo,
+                                                        const std::optional<Dictionary>& storebag,
+                                                        uint16_t category, uint16_t type,
+                                                        const std::optional<Dictionary>& payload) {
+  Log& log = platform().log;
+  const Value* sessionID = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoSessionID) : nullptr;
+  log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %ld",
+            static_cast<long>(sessionID != nullptr ? sessionID->longLongValue() : 0));
+  if (!sessionInfo || !storebag) {
+    // The leading "R" is part of the message that tools look for.
+    log.error("RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters");
+    return;
+  }
+  char deviceID[kDeviceIDSize] = {};
+  deviceIdentity().deviceUniqueIDCString(deviceID, kDeviceIDSize);
+  const std::optional<Backends> backends =
+      backendFactory_.createBackends(storebag, sessionInfo, userInfo, deviceID);
+  if (!backends || backends->empty()) {
+    log.error("sendMessageWithSessionInfo: No backends available to send single message");
+    return;
+  }
+  if (userInfo && !boolEntry(*sessionInfo, kKYTReportingSessionInfoRequireUserInfo))
+    log.error("sendMessageWithSessionInfo: user info provided without requiring it.");
+
+  const std::shared_ptr<ReportingSessionConnectivityHelper> helper = singleMessageHelper();
+  const TimeValue timestamp = platform().clock.timeOfDay();
+  for (const auto& [key, backend] : *backends) {
+    backend->updateState();
+    backend->setReportingSessionConnectivityDelegate(helper);
+    if (!backend->isWhitelistedEvent(category)) {
+      log.debug(
+          "sendMessageWithSessionInfo: Dropping event with category %d as it is not whitelisted for backend %s",
+          category, backend->name().c_str());
+      continue;
+    }
+    if (backend->isBlacklistedEvent(category)) {
+      log.debug(
+          "sendMessageWithSessionInfo: Dropping event with category %d as it is blacklisted for backend %s",
+          category, backend->name().c_str());
+      continue;
+    }
+    Dictionary message = payload.value_or(Dictionary());
+    if (deviceIdentity().isInternalBuild())
+      message.set("SerialNum", deviceIdentity().serialNumber().value_or("Unknown"));
+    const Value answer = backend->sendMessage(message, timestamp, category, type, MessageFlag{0});
+    if (!answer.isNull()) messageLog_.writeToLogFile("[%@ -> sendMessageWithSessionInfo] %@", {key, answer});
+  }
+  for (const auto& [key, backend] : *backends) backend->cleanup();
+}
+
+}  // namespace kyt

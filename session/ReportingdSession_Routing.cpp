@@ -1,0 +1,119 @@
+// The session's two doors for messages: the one that routes through its configured back ends, which its own
+// internal messages take too, and the one for single messages of clients that configure nothing.
+#include <utility>
+
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "session/MessageLog.h"
+#include "session/ReportingdSession.h"
+
+namespace kyt {
+
+void ReportingdSession::sendMessageWithDictionary(Dictionary message, ObjectReply reply) {
+  log().debug("sendMessageWithDictionary: Sending message for session %u", _sessionID);
+  Value answer = sendMessageWithDictionaryError(message);
+  if (reply) reply(std::move(answer));
+}
+
+Value ReportingdSession::sendMessageWithDictionaryError(const Dictionary& message) {
+  if (!hasBackends()) {
+    log().debug("sendMessageWithDictionary: No backends available to send message");
+    return nullptr;
+  }
+  const Value* category = message.find(kKYTReportingMessageParametersCategory);
+  if (category == nullptr) {
+    log().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
+    return nullptr;
+  }
+  const Value* type = message.find(kKYTReportingMessageParametersType);
+  if (type == nullptr) {
+    log().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
+    return nullptr;
+  }
+  const auto method = static_cast<uint16_t>(category->unsignedIntValue());
+  const auto respCode = static_cast<uint16_t>(type->unsignedIntValue());
+  const Value* flag = message.find(kKYTReportingMessageParametersFlag);
+  const auto messageFlag = MessageFlag{flag != nullptr ? static_cast<int32_t>(flag->unsignedIntValue()) : 0};
+  const Value* payloadValue = message.find(kKYTReportingMessageParametersPayload);
+  const Dictionary* payload = payloadValue != nullptr ? payloadValue->dictionary() : nullptr;
+  const TimeValue timestamp = platform().clock.timeOfDay();
+
+  // Every message, whatever the back ends' lists say of it.
+  aggregateMessage(_sessionInfo, timestamp.asSeconds(), method, respCode, payload);
+  return routeToBackends(envelopeWithPayload(payload), timestamp, method, respCode, messageFlag);
+}
+
+Dictionary ReportingdSession::envelopeWithPayload(const Dictionary* payload) {
+  Dictionary envelope;
+  // A session without a token never has shared data, so it need not wait for the monitor to learn that.
+  if (_hierarchyDictionary) {
+    MonitorLock lock(_sessionDelegate.monitor());
+    if (std::optional<Dictionary> sharedData = _sessionDelegate.sharedDataForSession(*this))
+      envelope.append(kKYTReportingMessageBlobSharedData, std::move(*sharedData));
+  }
+  if (payload != nullptr) envelope.append(kKYTReportingMessageBlobClientData, *payload);
+  return envelope;
+}
+
+Value ReportingdSession::routeToBackends(const Dictionary& envelope, const TimeValue& timestamp,
+                                         uint16_t category, uint16_t type, MessageFlag flag) {
+  Value answer;
+  for (const auto& [key, backend] : _backends) {
+    if (!backend->isWhitelistedEvent(category)) {
+      log().debug(
+          "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
+          category, backend->name().c_str());
+      continue;
+    }
+    if (backend->isBlacklistedEvent(category)) {
+      log().debug(
+          "sendMessageWithDictionary: Dropping event with category %d as it is blacklisted for backend %s",
+          category, backend->name().c_str());
+      continue;
+    }
+    Value result = backend->sendMessage(envelope, timestamp, category, type, flag);
+    if (result.isNull()) continue;
+    class_.messageLog().writeToLogFile("[%@ -> sendMessageWithDictionary] %@", {key, result});
+    const String& name = backend->name();
+    if (name == kKYTReportingBackendHTTPPost2 || name == kKYTReportingBackendHTTPPost ||
+        (name == kKYTReportingBackendDashboard && answer.isNull()))
+      answer = std::move(result);
+  }
+  return answer;
+}
+
+// The time stamp is not used: an internal message is stamped anew, like any other.
+void ReportingdSession::internalSendMessage(std::optional<Dictionary> payload, const TimeValue& /*timestamp*/,
+                                            uint16_t method, uint16_t respCode) {
+  Dictionary message{{kKYTReportingMessageParametersCategory, static_cast<unsigned>(method)},
+                     {kKYTReportingMessageParametersType, static_cast<unsigned>(respCode)}};
+  if (payload) message.set(kKYTReportingMessageParametersPayload, std::move(*payload));
+  message.set(kKYTReportingMessageParametersFlag, 0U);
+  // Nobody waits for the answer of an internal message.
+  static_cast<void>(sendMessageWithDictionaryError(message));
+  log().debug("internalSendMessage: Sent internal message (method:%d respCode:%d)", method, respCode);
+}
+
+void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
+                                                   uint16_t category, uint16_t type,
+                                                   std::optional<Dictionary> payload, StringReply reply) {
+  if (!sessionInfo.contains(kKYTReportingSessionInfoClientType) ||
+      !sessionInfo.contains(kKYTReportingSessionInfoSessionID)) {
+    log().error("sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo");
+    if (reply) reply("Could not retrieve identifiers from sessionInfo");
+    return;
+  }
+  takeOverIdentity(sessionInfo);
+  receivedUserInfo(userInfo);
+  log().debug("sendMessageWithSessionInfo: Sending message with session info for session %u", _sessionID);
+  const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
+  if (!storebag) {
+    if (reply) reply("storebag not available");
+    return;
+  }
+  class_.sendMessageWithSessionInfo(sessionInfo, userInfo, storebag, category, type, payload);
+  if (reply) reply("finished");
+}
+
+}  // namespace kyt
