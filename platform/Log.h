@@ -1,9 +1,9 @@
-// The structured log. Three levels; every line begins with the operation that writes it. Texts are printf formats,
-// checked by the compiler. Lines below the level in force cost one relaxed load.
+// The structured log. Three levels; every line begins with the operation that writes it. Texts are printf
+// formats, checked by the compiler. Lines below the level in force cost one relaxed load.
 //
-// A `Log` may be called from any thread, never fails and never throws. What came from outside (a client's name, a
-// server's reply) may hold anything: the sinks escape control characters and invalid UTF-8. Owned by the composition
-// root; everyone else holds a reference.
+// A `Log` may be called from any thread, never fails and never throws. What came from outside (a client's
+// name, a server's reply) may hold anything: the sinks escape control characters and invalid UTF-8. Owned by
+// the composition root; everyone else holds a reference.
 #pragma once
 
 #include <atomic>
@@ -15,7 +15,11 @@
 
 namespace kyt {
 
-enum class LogLevel : int { debug = 0, normal = 1, error = 2 };  // "default" in settings and on the command line
+enum class LogLevel : int {
+  debug = 0,
+  normal = 1,
+  error = 2
+};  // "default" in settings and on the command line
 
 // Where lines go: journald, standard error, or a test's memory. Called from any thread, concurrently.
 class LogSink {
@@ -26,7 +30,8 @@ class LogSink {
 
 class Log {
  public:
-  explicit Log(LogSink& sink, LogLevel level = LogLevel::normal) : sink_(&sink), level_(static_cast<int>(level)) {}
+  explicit Log(LogSink& sink, LogLevel level = LogLevel::normal)
+      : sink_(&sink), level_(static_cast<int>(level)) {}
   Log(const Log&) = delete;
   Log& operator=(const Log&) = delete;
 
@@ -42,17 +47,17 @@ class Log {
   void normal(const char* format, ...) __attribute__((format(printf, 2, 3)));  // the level "default"
   void error(const char* format, ...) __attribute__((format(printf, 2, 3)));
 
-  // For the formats that show an object as "%@": every "%@" and "%s" takes the next argument, a Value, as its
-  // description. No other conversion may stand in such a format.
+  // For the formats that show an object as "%@", which the compiler cannot check: see formatObjects.
   void debugObjects(const char* format, std::initializer_list<Value> objects);
 
  private:
-  void write(LogLevel level, const char* format, va_list arguments);
+  void write(LogLevel level, const char* format, va_list arguments) __attribute__((format(printf, 3, 0)));
   LogSink* sink_;
   std::atomic<int> level_;
 };
 
-// Fills a "%@" template: every "%@" takes the next object's description, "%%" is a percent sign.
+// Fills a "%@" template: every conversion, "%@", "%s", "%u" or another (its flags and width are ignored),
+// takes the next object's description; a missing object prints as "(null)"; "%%" is a percent sign.
 [[nodiscard]] std::string formatObjects(const char* format, std::initializer_list<Value> objects);
 
 }  // namespace kyt

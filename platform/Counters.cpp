@@ -1,0 +1,80 @@
+#include "platform/Counters.h"
+
+#include <algorithm>
+
+namespace kyt {
+
+const char* reasonName(Reason reason) {
+  switch (reason) {
+    case Reason::malformedMessage:
+      return "malformed-message";
+    case Reason::invalidArguments:
+      return "invalid-arguments";
+    case Reason::unentitledConnection:
+      return "unentitled-connection";
+    case Reason::handshakeFailed:
+      return "handshake-failed";
+    case Reason::handshakeTimedOut:
+      return "handshake-timed-out";
+    case Reason::messageTooLong:
+      return "message-too-long";
+    case Reason::tooManyConnections:
+      return "too-many-connections";
+    case Reason::tooManyConnectionsOfUser:
+      return "too-many-connections-of-user";
+    case Reason::queuedBytesExceeded:
+      return "queued-bytes-exceeded";
+    case Reason::clientNotReading:
+      return "client-not-reading";
+    case Reason::aggregatorMessageDropped:
+      return "aggregator-message-dropped";
+    case Reason::batchFull:
+      return "batch-full";
+    case Reason::eventDroppedByState:
+      return "event-dropped-by-state";
+    case Reason::batchDiscarded:
+      return "batch-discarded";
+    case Reason::batchedEventFiltered:
+      return "batched-event-filtered";
+    case Reason::postWithoutURL:
+      return "post-without-url";
+    case Reason::postFailed:
+      return "post-failed";
+    case Reason::postRefused:
+      return "post-refused";
+    case Reason::waitingRequestDisplaced:
+      return "waiting-request-displaced";
+    case Reason::workersExhausted:
+      return "workers-exhausted";
+    case Reason::sharedDataRefused:
+      return "shared-data-refused";
+    case Reason::hierarchyTokenRefused:
+      return "hierarchy-token-refused";
+    case Reason::uploadTooLarge:
+      return "upload-too-large";
+    case Reason::customIdentifierRefused:
+      return "custom-identifier-refused";
+    case Reason::badUserDefaultsFile:
+      return "bad-user-defaults-file";
+    case Reason::badEntitlementsFile:
+      return "bad-entitlements-file";
+    case Reason::valueNotPostable:
+      return "value-not-postable";
+    case Reason::numberOfReasons:
+      break;
+  }
+  return "unknown";
+}
+
+bool Counters::addAndMayLog(Reason reason, MonotonicTime now, uint64_t count) {
+  add(reason, count);
+  constexpr int64_t kMinute = std::chrono::nanoseconds(std::chrono::minutes(1)).count();
+  std::atomic<int64_t>& lastLogged = lastLogged_[static_cast<size_t>(reason)];
+  // A clock that has just started may read 0, which stands for "never".
+  const int64_t time = std::max<int64_t>(now.time_since_epoch().count(), 1);
+  int64_t last = lastLogged.load(std::memory_order_relaxed);
+  if (last != 0 && time - last < kMinute) return false;
+  return lastLogged.compare_exchange_strong(last, time, std::memory_order_relaxed);
+}
+
+}  // namespace kyt

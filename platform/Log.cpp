@@ -1,0 +1,53 @@
+#include "platform/Log.h"
+
+#include <cstdio>
+#include <string>
+
+namespace kyt {
+
+void Log::debug(const char* format, ...) {
+  if (!enabled(LogLevel::debug)) return;
+  va_list arguments;
+  va_start(arguments, format);
+  write(LogLevel::debug, format, arguments);
+  va_end(arguments);
+}
+
+void Log::normal(const char* format, ...) {
+  if (!enabled(LogLevel::normal)) return;
+  va_list arguments;
+  va_start(arguments, format);
+  write(LogLevel::normal, format, arguments);
+  va_end(arguments);
+}
+
+void Log::error(const char* format, ...) {
+  if (!enabled(LogLevel::error)) return;
+  va_list arguments;
+  va_start(arguments, format);
+  write(LogLevel::error, format, arguments);
+  va_end(arguments);
+}
+
+void Log::debugObjects(const char* format, std::initializer_list<Value> objects) {
+  if (enabled(LogLevel::debug)) sink_->write(LogLevel::debug, formatObjects(format, objects));
+}
+
+void Log::write(LogLevel level, const char* format, va_list arguments) {
+  char buffer[1024];
+  va_list again;
+  va_copy(again, arguments);
+  const int length = std::vsnprintf(buffer, sizeof buffer, format, arguments);
+  if (length < 0) {
+    sink_->write(level, format);  // a conversion failed: what it was about is better than nothing
+  } else if (static_cast<size_t>(length) < sizeof buffer) {
+    sink_->write(level, std::string_view(buffer, static_cast<size_t>(length)));
+  } else {
+    std::string line(static_cast<size_t>(length), '\0');
+    std::vsnprintf(line.data(), line.size() + 1, format, again);
+    sink_->write(level, line);
+  }
+  va_end(again);
+}
+
+}  // namespace kyt

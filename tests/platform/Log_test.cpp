@@ -1,0 +1,69 @@
+#include "platform/Log.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "platform/fake/MemoryLogSink.h"
+
+namespace kyt {
+namespace {
+
+using Line = MemoryLogSink::Line;
+
+TEST(Log, FormatsLinesOfEachLevel) {
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::debug);
+  log.debug("storebagForSession: found for client type %d", 7);
+  log.normal("%s and %s", "one", "two");
+  log.error("plain");
+  EXPECT_EQ(sink.lines(), (std::vector<Line>{{LogLevel::debug, "storebagForSession: found for client type 7"},
+                                             {LogLevel::normal, "one and two"},
+                                             {LogLevel::error, "plain"}}));
+}
+
+TEST(Log, WritesNothingBelowItsLevel) {
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::error);
+  log.debug("d");
+  log.normal("n");
+  log.debugObjects("%@", {1});
+  EXPECT_TRUE(sink.lines().empty());
+  log.setLevel(LogLevel::normal);
+  log.debug("d");
+  log.normal("n");
+  EXPECT_EQ(sink.lines(), (std::vector<Line>{{LogLevel::normal, "n"}}));
+  EXPECT_FALSE(log.debugEnabled());
+}
+
+TEST(Log, KeepsLinesOfAnyLengthWhole) {
+  MemoryLogSink sink;
+  Log log(sink);
+  for (const size_t size : {1022U, 1023U, 1024U, 1025U, 100000U}) {
+    sink.clear();
+    const std::string text(size, 'x');
+    log.error("%s%d", text.c_str(), 4);
+    ASSERT_EQ(sink.lines().size(), 1U);
+    EXPECT_EQ(sink.lines()[0].line, text + "4");
+  }
+}
+
+TEST(Log, PrintsAMissingTextAsNull) {
+  MemoryLogSink sink;
+  Log log(sink);
+  const char* volatile missing = nullptr;
+  log.error("address %s", missing);
+  EXPECT_EQ(sink.lines()[0].line, "address (null)");
+}
+
+TEST(Log, ShowsObjectsByTheirDescription) {
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::debug);
+  log.debugObjects("post %@ to %s", {Dictionary{{"a", 1}}, "here"});
+  EXPECT_TRUE(sink.contains(LogLevel::debug, "post {\"a\":1} to here"));
+  EXPECT_FALSE(sink.contains(LogLevel::error, "post"));
+  EXPECT_EQ(sink.count("post"), 1U);
+}
+
+}  // namespace
+}  // namespace kyt
