@@ -1,0 +1,121 @@
+#include "backends/https/EventFilters.h"
+
+#include <algorithm>
+
+#include "backend/Text.h"
+
+namespace kyt {
+
+namespace {
+
+uint64_t lengthBit(size_t length) {
+  return uint64_t{1} << std::min<size_t>(length, 63);
+}
+
+template <typename Matches>
+bool matchList(const Array* list, const String* wholeString, bool whitelist, Matches matches) {
+  if (list == nullptr || list->empty()) return whitelist;
+  if (wholeString == nullptr) return !whitelist;
+  const std::string whole = foldCase(*wholeString);
+  return std::any_of(list->begin(), list->end(), [&](const Value& element) {
+    const String* text = element.string();
+    return text != nullptr && !text->empty() && matches(whole, foldCase(*text));
+  });
+}
+
+int32_t intEntry(const Dictionary& dictionary, const char* key, int32_t absent) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->intValue() : absent;
+}
+
+// What is hashed for a value: its own text, or the text that a reader would see posted. None for what could
+// not be posted and must not leave unhashed.
+std::optional<String> textToHash(const Value& value) {
+  switch (value.kind()) {
+    case Value::Kind::string:
+      return *value.string();
+    case Value::Kind::date:
+      return String(description(Value(value.date()->secondsSince1970)));
+    case Value::Kind::data: {
+      std::string hex;
+      appendHex(value.data()->bytes(), hex);
+      return String(hex);
+    }
+    case Value::Kind::null:
+    case Value::Kind::array:
+    case Value::Kind::dictionary:
+      return std::nullopt;
+    default:
+      return String(description(value));
+  }
+}
+
+}  // namespace
+
+bool matchExactStringWithList(const Array* list, const String* wholeString, bool whitelist) {
+  return matchList(list, wholeString, whitelist,
+                   [](const std::string& whole, const std::string& element) { return whole == element; });
+}
+
+bool matchStringWithList(const Array* list, const String* wholeString, bool whitelist) {
+  return matchList(list, wholeString, whitelist, [](const std::string& whole, const std::string& element) {
+    return whole.find(element) != std::string::npos;
+  });
+}
+
+void EventFilters::createFiltersFromArray(const Array& filters) {
+  if (filters.empty()) return;
+  filters_.clear();
+  filters_.reserve(filters.size());
+  keyLengths_ = 0;
+  for (const Value& element : filters) {
+    Filter filter;
+    if (const Dictionary* dictionary = element.dictionary()) {
+      filter.method = intEntry(*dictionary, "method", -1);
+      filter.status = intEntry(*dictionary, "status", -1);
+      const Value* key = dictionary->find("key");
+      if (key != nullptr && key->string() != nullptr) filter.foldedKey = foldCase(*key->string());
+      const Value* action = dictionary->find("action");
+      const String* name = action != nullptr ? action->string() : nullptr;
+      if (name != nullptr && *name == "remove") filter.action = Action::remove;
+      if (name != nullptr && *name == "sha256") filter.action = Action::sha256;
+    }
+    // Without a key it takes its place in the table and is about no key.
+    if (!filter.foldedKey.empty()) keyLengths_ |= lengthBit(filter.foldedKey.size());
+    filters_.push_back(std::move(filter));
+  }
+}
+
+EventFilters::Action EventFilters::actionForKey(std::string_view key, int32_t method, int32_t status) const {
+  if ((keyLengths_ & lengthBit(key.size())) == 0 || key.empty()) return Action::keep;
+  for (const Filter& filter : filters_) {
+    if (filter.foldedKey.size() != key.size()) continue;
+    if (filter.method >= 0 && filter.method != method) continue;
+    if (filter.status >= 0 && filter.status != status) continue;
+    if (equalsFolded(key, filter.foldedKey)) return filter.action;
+  }
+  return Action::keep;
+}
+
+void EventFilters::filterEvent(Dictionary& event, Digest& digest) const {
+  if (filters_.empty()) return;
+  // Read before any change; a record without them counts as method 0 and status 0, deliberately.
+  const int32_t method = intEntry(event, "_method", 0);
+  const int32_t status = intEntry(event, "_status", 0);
+  event.removeIf([&](const String& key, Value& value) {
+    switch (actionForKey(key, method, status)) {
+      case Action::keep:
+        return false;
+      case Action::remove:
+        return true;
+      case Action::sha256:
+        break;
+    }
+    const std::optional<String> text = textToHash(value);
+    if (!text) return true;
+    value = Value(digest(*text));
+    return false;
+  });
+}
+
+}  // namespace kyt

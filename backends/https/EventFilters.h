@@ -1,0 +1,51 @@
+// Which keys of an event record are removed, or replaced by their SHA-256 text, before it leaves the device;
+// and the two rules by which a name is looked for in a list of the storebag. Used by HTTPSPostBackend alone,
+// on its session's queue.
+//
+// Texts are compared without case (backend/Text.h). Keys are folded once, when the table is built: each
+// record of each event passes all filters.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/Function.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+// `list` may be null: a missing list. An empty or missing list answers `whitelist`, a missing string the
+// opposite; otherwise whether some element equals the string. An empty element matches nothing.
+[[nodiscard]] bool matchExactStringWithList(const Array* list, const String* wholeString, bool whitelist);
+// The same, but whether the string contains some element.
+[[nodiscard]] bool matchStringWithList(const Array* list, const String* wholeString, bool whitelist);
+
+class EventFilters {
+ public:
+  enum class Action : int32_t { keep = 0, remove = 1, sha256 = 2 };
+  // The text of the digest of a text.
+  using Digest = Function<String(const String&)>;
+
+  // Builds the table from the storebag's filter dictionaries. An empty array deliberately leaves the earlier
+  // table in force: a bag that forgets its filters must not lay the keys open.
+  void createFiltersFromArray(const Array& filters);
+  // For each key of the record the first filter in table order that is about it decides, whatever follows.
+  void filterEvent(Dictionary& event, Digest& digest) const;
+  [[nodiscard]] int32_t numberOfFilters() const { return static_cast<int32_t>(filters_.size()); }
+
+ private:
+  struct Filter {
+    int32_t method = -1;  // negative: any
+    int32_t status = -1;  // negative: any
+    Action action = Action::keep;
+    std::string foldedKey;
+  };
+  [[nodiscard]] Action actionForKey(std::string_view key, int32_t method, int32_t status) const;
+
+  std::vector<Filter> filters_;
+  uint64_t keyLengths_ = 0;  // bit n (63: and more): some filter's key has n bytes
+};
+
+}  // namespace kyt

@@ -1,0 +1,152 @@
+#include "backends/https/HTTPSPostBackend.h"
+
+#include "platform/Counters.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/SerialQueue.h"
+#include "platform/UserDefaults.h"
+
+namespace kyt {
+
+namespace {
+
+bool isSessionStop(uint16_t method, uint16_t respCode) {
+  return method == 0 && respCode == 1;
+}
+
+Value numberOrMinusOne(Value number) {
+  return number.isNull() ? Value(-1) : number;
+}
+
+}  // namespace
+
+std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(Configuration& configuration,
+                                                                 const std::optional<String>& name,
+                                                                 const std::optional<Dictionary>& profile,
+                                                                 std::optional<String> productFamily) {
+  struct Made final : HTTPSPostBackend {
+    Made(Configuration& c, String n, Dictionary p, std::optional<String> f)
+        : HTTPSPostBackend(c, std::move(n), std::move(p), std::move(f)) {}
+  };
+  if (!name || !profile) return nullptr;
+  const Value* clients = profile->find("clients");
+  if (clients == nullptr || !clients->isArray()) {
+    configuration.platform.log.error("HTTPSPostBackend(initWithName): can't find the client list.");
+    return nullptr;
+  }
+  return std::make_shared<Made>(configuration, *name, *profile, std::move(productFamily));
+}
+
+HTTPSPostBackend::HTTPSPostBackend(Configuration& configuration, String name, Dictionary profile,
+                                   std::optional<String> productFamily)
+    : KYTReportingBackend(configuration.platform, std::move(name), std::move(profile),
+                          std::move(productFamily)),
+      configuration_(configuration) {
+  readUserDefaults();
+  if (const Value* displayURL = profile_.find("display_url"); displayURL != nullptr)
+    if (const String* text = displayURL->string()) displayURL_ = *text;
+  dnuEnabled_ = platform_.consent.isSubmissionAllowed();
+  uuidRespectDnu_ = getPersistentIdentifierForDNU(true);
+  uuidOverrideDnu_ = getPersistentIdentifierForDNU(false);
+}
+
+HTTPSPostBackend::~HTTPSPostBackend() {
+  drainStateQueue();
+}
+
+void HTTPSPostBackend::readUserDefaults() {
+  UserDefaults& defaults = platform_.userDefaults;
+  const Value post = defaults.value(kKYTReportingDefaultsDomain, "httpsPostURL");
+  if (const String* url = post.string()) {
+    platform_.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for postURL", url->c_str());
+    postURL_ = *url;
+    useDefaultPostURL_ = true;
+  }
+  const Value realtime = defaults.value(kKYTReportingDefaultsDomain, "httpsRealtimePostURL");
+  if (const String* url = realtime.string()) {
+    platform_.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL",
+                        url->c_str());
+    realtimePostURL_ = *url;
+    useDefaultRealtimePostURL_ = true;
+  }
+  forceEventLogging_ = defaults.value(kKYTReportingDefaultsDomain, "forceEventLogging").boolValue();
+}
+
+const String* HTTPSPostBackend::userInfoText(const char* key) const {
+  const Value* value = userInfoDict_ ? userInfoDict_->find(key) : nullptr;
+  return value != nullptr ? value->string() : nullptr;
+}
+
+Dictionary HTTPSPostBackend::mutablePayload(const Dictionary& message) const {
+  const Value* clientData = message.find(kKYTReportingMessageBlobClientData);
+  // The single-message door sends the bare payload.
+  if (clientData == nullptr) return message;
+  if (const Dictionary* payload = clientData->dictionary()) return *payload;
+  platform_.log.error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
+  return {};
+}
+
+void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
+  platform_.log.debug(
+      "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message "
+      "dictionary");
+  payload.set("Opt", dnuType_);
+  payload.set("SamplingThreshold", numberOrMinusOne(samplingThreshold()));
+  payload.set("OverrideSampling", numberOrMinusOne(overrideSampling_));
+  payload.set("Batch", batchEvents_ ? 1u : 0u);
+}
+
+Value HTTPSPostBackend::sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+                                    uint16_t respCode, EventID eventID, MessageFlag flag) {
+  const int32_t oldState = state();
+  if (oldState == kBackendStateDisabled) {
+    platform_.counters.add(Reason::eventDroppedByState);
+    return {};
+  }
+  Dictionary payload = mutablePayload(message);
+  if (isSessionStop(method, respCode)) addStopEntries(payload);
+  const Value* shared = message.find(kKYTReportingMessageBlobSharedData);
+  const Dictionary* frameworkData = shared != nullptr ? shared->dictionary() : nullptr;
+  Dictionary record = newEventDictfromPayload(payload, timestamp, method, respCode, eventID,
+                                              frameworkData != nullptr ? frameworkData->size() : 0);
+  prepareEventForMessage(record, frameworkData);
+  // This message is deliberately still handled with the old state: it is the last of the batch that it frees.
+  if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled);
+  platform_.log.debug("HTTPSPostBackend(sendMessage): realtime is %d", isRealtime(flag));
+  const bool undecided = oldState == kBackendStateUndecided || oldState == kBackendStateHeld;
+  if (undecided || (!isRealtime(flag) && batchEvents_) || (requireUserInfo_ && !hasUserInfo())) {
+    platform_.log.debug("HTTPSPostBackend(sendMessage): Batching %d, %d, %d", oldState, batchEvents_,
+                        requireUserInfo_);
+    return batchEvent(std::move(record));
+  }
+  return sendStandalone(std::move(record), oldState, method, respCode, flag);
+}
+
+Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
+                                       MessageFlag flag) {
+  Value flushed;
+  if (state == kBackendStateEnabled && isRealtime(flag) &&
+      stateQueue().sync([this] { return batchedEvents_.has_value(); })) {
+    platform_.log.debug(
+        "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. "
+        "Forcing Flush here to keep events in order.");
+    flushed = flushMessagesWithCompletion(nullptr);
+  }
+  platform_.log.debug("HTTPSPostBackend(sendMessage): Sending %d, %d, %d", state, batchEvents_,
+                      requireUserInfo_);
+  Array records;
+  records.append(Value(std::move(record)));
+  Value text;
+  std::optional<std::string> json = createMessageForPostAndLogging(std::move(records), &text);
+  if (!json) return {};
+  if (!flushed.isNull()) {
+    text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
+    immutable_ = true;
+  }
+  postJSONMessage(std::move(*json), flag, method, respCode, nullptr);
+  return text;
+}
+
+}  // namespace kyt

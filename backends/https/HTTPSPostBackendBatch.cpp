@@ -1,0 +1,224 @@
+// The batch and its flush. What touches the batch runs on the state queue; messages are built and completions
+// run after it has been left.
+#include <algorithm>
+
+#include "backends/https/HTTPSPostBackend.h"
+#include "platform/Counters.h"
+#include "platform/Keys.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/ObjectSize.h"
+#include "platform/Platform.h"
+#include "platform/SerialQueue.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr size_t kInlineText = 15;     // longer texts own a block
+constexpr size_t kBlockOverhead = 32;  // header of a block, and the allocator's
+
+size_t textBytes(const String& text) {
+  return text.size() > kInlineText ? kBlockOverhead + text.size() : 0;
+}
+
+// What a record holds, roughly: for the limit of the batch, where the health report's estimate would cost a
+// query of the allocator for each block of each event.
+size_t heldBytes(const Dictionary& dictionary);
+
+size_t heldBytes(const Value& value) {
+  switch (value.kind()) {
+    case Value::Kind::string:
+      return textBytes(*value.string());
+    case Value::Kind::data:
+      return kBlockOverhead + value.data()->size();
+    case Value::Kind::dictionary:
+      return heldBytes(*value.dictionary());
+    case Value::Kind::array: {
+      size_t bytes = kBlockOverhead + value.array()->size() * sizeof(Value);
+      for (const Value& element : *value.array()) bytes += heldBytes(element);
+      return bytes;
+    }
+    default:
+      return 0;
+  }
+}
+
+size_t heldBytes(const Dictionary& dictionary) {
+  size_t bytes = kBlockOverhead + dictionary.size() * sizeof(DictionaryEntry);
+  for (const DictionaryEntry& entry : dictionary) bytes += textBytes(entry.key) + heldBytes(entry.value);
+  return bytes;
+}
+
+int32_t methodOf(const Dictionary& record) {
+  const Value* method = record.find("_method");
+  return method != nullptr ? method->intValue() : 0;
+}
+
+Error localError(const char* text) {
+  return Error{kKYTReportingErrorDomain, -1, text};
+}
+
+void complete(FlushCompletion& completion, Error error) {
+  if (completion) completion(Value(), std::move(error));
+}
+
+}  // namespace
+
+int32_t HTTPSPostBackend::countOnQueue(int32_t method) const {
+  const auto found = std::lower_bound(eventMethodCounts_.begin(), eventMethodCounts_.end(),
+                                      std::pair<int32_t, int32_t>{method, 0});
+  return found != eventMethodCounts_.end() && found->first == method ? found->second : 0;
+}
+
+void HTTPSPostBackend::appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes) {
+  if (!batchedEvents_) batchedEvents_.emplace();
+  batchedEvents_->append(Value(std::move(record)));
+  batchedBytes_ += bytes;
+  const auto place = std::lower_bound(eventMethodCounts_.begin(), eventMethodCounts_.end(),
+                                      std::pair<int32_t, int32_t>{method, 0});
+  if (place != eventMethodCounts_.end() && place->first == method) {
+    place->second = count;
+  } else {
+    eventMethodCounts_.insert(place, {method, count});
+  }
+}
+
+Value HTTPSPostBackend::batchEvent(Dictionary record) {
+  const int32_t method = methodOf(record);
+  uint64_t batched = 0;
+  int32_t count = stateQueue().sync([&] {
+    if (!batchedEvents_) batchedEvents_.emplace();
+    batched = batchedBytes_;
+    return countOnQueue(method);
+  });
+  Value flushed;
+  if (count > eventThreshold_) {
+    platform_.log.debug(
+        "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method %d",
+        method);
+    flushed = flushMessagesWithCompletion(nullptr);
+    count = 0;
+    batched = stateQueue().sync([this] { return batchedBytes_; });  // a flush may have kept the batch
+  }
+  const uint64_t bytes = heldBytes(record);
+  if (batched + bytes > platform_.limits.maxBatchBytes) {
+    countDroppedByLimit();
+    return flushed;
+  }
+  stateQueue().async([this, record = std::move(record), method, count, bytes]() mutable {
+    appendOnQueue(std::move(record), method, count + 1, bytes);
+  });
+  return flushed;
+}
+
+void HTTPSPostBackend::countDroppedByLimit() const {
+  if (!platform_.counters.addAndMayLog(Reason::batchFull, platform_.clock.monotonic())) return;
+  platform_.log.error(
+      "HTTPSPostBackend(batchEvent): the batch of backend %s is full (%llu bytes), dropping events",
+      name_.c_str(), static_cast<unsigned long long>(platform_.limits.maxBatchBytes));
+}
+
+HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records) {
+  if (!batchedEvents_) return BatchTaking::nothing;
+  const bool enabled = state_ == kBackendStateEnabled;
+  if (enabled && requireUserInfo_ && !hasUserInfo()) return BatchTaking::userInfoMissing;
+  records = std::move(*batchedEvents_);
+  batchedEvents_.reset();
+  eventMethodCounts_.clear();
+  batchedBytes_ = 0;
+  return enabled ? BatchTaking::taken : BatchTaking::discarded;
+}
+
+Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
+  Array batch;
+  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch); })) {
+    case BatchTaking::discarded:
+      platform_.counters.add(Reason::batchDiscarded, batch.size());
+      [[fallthrough]];
+    case BatchTaking::nothing:
+      complete(completion, localError("Nothing to flush"));
+      return {};
+    case BatchTaking::userInfoMissing:
+      complete(completion, localError("Can not flush: userInfo is required"));
+      return {};
+    case BatchTaking::taken:
+      break;
+  }
+  platform_.log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
+  Array records = recordsToPost(std::move(batch));
+  Value pretty;
+  std::optional<std::string> json;
+  if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty);
+  if (!json) {
+    complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
+    return {};
+  }
+  FlushCompletion answer;
+  if (completion)
+    answer = [pretty, completion = std::move(completion)](const Value&, std::optional<Error> error) mutable {
+      completion(pretty, std::move(error));
+    };
+  postJSONMessage(std::move(*json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer));
+  if (!pretty.isNull()) immutable_ = true;
+  return pretty;
+}
+
+bool HTTPSPostBackend::admits(const Dictionary& record) const {
+  const auto category = static_cast<uint16_t>(methodOf(record));
+  if (!isWhitelistedEvent(category)) {
+    platform_.log.debug(
+        "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend "
+        "%s",
+        category, name_.c_str());
+    return false;
+  }
+  if (isBlacklistedEvent(category)) {
+    platform_.log.debug(
+        "flushMessagesWithCompletion: Dropping event with category %d as it is blacklisted for backend %s",
+        category, name_.c_str());
+    return false;
+  }
+  return true;
+}
+
+// The records that the lists admit, each with the user information of now, filtered, over what it had.
+Array HTTPSPostBackend::recordsToPost(Array batch) const {
+  Dictionary userInfo;
+  if (userInfoDict_) userInfo = *userInfoDict_;
+  filterEvent(userInfo);
+  Array records;
+  records.reserve(batch.size());
+  Value* values = batch.mutableBegin();
+  for (size_t i = 0; i < batch.size(); ++i) {
+    Dictionary* record = values[i].mutableDictionary();
+    if (!admits(*record)) {
+      platform_.counters.add(Reason::batchedEventFiltered);
+      continue;
+    }
+    record->merge(userInfo);
+    records.append(std::move(values[i]));
+  }
+  return records;
+}
+
+void HTTPSPostBackend::setCorrelatedSessionID(const String& sessionID) {
+  stateQueue().sync([&] {
+    combinedSessionIDString_ = sessionID;
+    if (!batchedEvents_) return;
+    Value* values = batchedEvents_->mutableBegin();
+    for (size_t i = 0; i < batchedEvents_->size(); ++i)
+      values[i].mutableDictionary()->set("_sessionID", Value(sessionID));
+  });
+}
+
+uint64_t HTTPSPostBackend::batchedEventsSize() const {
+  return stateQueue().sync([this] {
+    uint64_t size = 0;
+    if (batchedEvents_)
+      for (const Value& record : *batchedEvents_) size += objectSizeEstimate(record, platform_.memory);
+    return size;
+  });
+}
+
+}  // namespace kyt

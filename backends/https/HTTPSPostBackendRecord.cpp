@@ -1,0 +1,135 @@
+// An event's record. The keys are inline strings, made once: the road of one event allocates one block for
+// its record.
+#include <array>
+#include <cmath>
+#include <string_view>
+
+#include "backends/https/HTTPSPostBackend.h"
+#include "config/ClientTypes.h"
+#include "config/DeviceIdentity.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr size_t kFixedKeys = 16;
+constexpr int64_t kSecondsPerMinute = 60;
+
+constexpr int32_t kClientTypeQH = 7;
+constexpr int32_t kClientTypeQM = 11;
+constexpr int32_t kClientTypeQPRAV = 13;
+
+struct RecordKeys {
+  String startTS{"_startTS"}, sender{"_sender"}, clientVersion{"_clientVersion"}, sessionID{"_sessionID"};
+  String eventNumber{"_eventNumber"}, method{"_method"}, status{"_status"}, clientTS{"_clientTS"};
+  String eventTime{"eventTime"}, productFamily{"_productFamily"}, productModel{"_productModel"};
+  String osVersion{"_osVersion"}, build{"_build"}, internal{"_internal"}, reportVers{"_reportVers"};
+  String timezoneOffset{"_timezoneOffset"};
+};
+
+const RecordKeys& recordKeys() {
+  static const RecordKeys keys;
+  return keys;
+}
+
+// A fixed key begins with an underscore, or is the one that does not.
+bool mayHoldFixedKey(const Dictionary& payload) {
+  for (const DictionaryEntry& entry : payload) {
+    const std::string_view key = entry.key.view();
+    if (!key.empty() && (key[0] == '_' || key == "eventTime")) return true;
+  }
+  return false;
+}
+
+// Sets entries over a payload, with a look-up only where the payload may hold the key.
+class RecordWriter {
+ public:
+  RecordWriter(Dictionary& record, bool mayReplace) : record_(record), mayReplace_(mayReplace) {}
+  void set(const String& key, Value value) {
+    if (mayReplace_) {
+      record_.set(key, std::move(value));
+    } else {
+      record_.append(key, std::move(value));
+    }
+  }
+  void setWhenKnown(const String& key, const std::optional<String>& value) {
+    if (value) set(key, Value(*value));
+  }
+
+ private:
+  Dictionary& record_;
+  const bool mayReplace_;
+};
+
+}  // namespace
+
+// "." and the minor, or nothing when that is 0.
+std::string HTTPSPostBackend::versionSuffix() const {
+  return selfVersionMinor_ != 0 ? "." + std::to_string(selfVersionMinor_) : std::string();
+}
+
+// Formatted when the version changes, not for every event.
+const String& HTTPSPostBackend::reportVersion() const {
+  const std::array<uint8_t, 3> version{selfVersionMajor_, selfVersionMiddle_, selfVersionMinor_};
+  if (!reportVersionOf_ || *reportVersionOf_ != version) {
+    reportVersion_ =
+        String(formatObjects("%u.%u%@", {unsigned{version[0]}, unsigned{version[1]}, versionSuffix()}));
+    reportVersionOf_ = version;
+  }
+  return reportVersion_;
+}
+
+Dictionary HTTPSPostBackend::newEventDictfromPayload(const Dictionary& payload, const TimeValue& timestamp,
+                                                     uint16_t method, uint16_t respCode, EventID,
+                                                     size_t room) const {
+  const RecordKeys& keys = recordKeys();
+  Dictionary record = payload;
+  record.reserve(payload.size() + kFixedKeys + room + (userInfoDict_ ? userInfoDict_->size() : 0));
+  RecordWriter writer(record, mayHoldFixedKey(payload));
+
+  const int64_t startTS = Value(startTimeStamp_).longLongValue() / kSecondsPerMinute * kSecondsPerMinute;
+  writer.set(keys.startTS, startTS);
+  writer.set(keys.sender, clientTypeShortCode(compType_));
+  writer.set(keys.clientVersion, static_cast<unsigned>(clientVersion_));
+  const bool numericSessionID =
+      compType_ == kClientTypeQH ||
+      (isInternal_ && (compType_ == kClientTypeQM || compType_ == kClientTypeQPRAV));
+  if (numericSessionID) {
+    writer.set(keys.sessionID, sessionID_);
+  } else {
+    writer.setWhenKnown(keys.sessionID, combinedSessionIDString());
+  }
+  writer.set(keys.eventNumber, static_cast<unsigned>(eventID_));
+  writer.set(keys.method, static_cast<unsigned>(method));
+  writer.set(keys.status, static_cast<unsigned>(respCode));
+  // The offset is added to the start cut to its minute, deliberately: records tell the session's course, not
+  // when exactly it began.
+  double clientTS = static_cast<double>(startTS) + (timestamp.asSeconds() - startTimeStamp_);
+  if (!std::isfinite(clientTS)) clientTS = -1.0;
+  writer.set(keys.clientTS, clientTS);
+  writer.set(keys.eventTime, clientTS);
+  writer.setWhenKnown(keys.productFamily, productFamily_);
+  writer.setWhenKnown(keys.productModel, hardwareType_);
+  writer.setWhenKnown(keys.osVersion, productVersion_);
+  writer.setWhenKnown(keys.build, buildVersion_);
+  writer.set(keys.internal, configuration_.deviceIdentity.isInternalBuild() ? 1u : 0u);
+  writer.set(keys.reportVers, reportVersion());
+  writer.set(keys.timezoneOffset, platform_.deviceProperties.secondsFromGMT(platform_.clock.timeOfDay()));
+  return record;
+}
+
+void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const {
+  if (userInfoDict_) event.merge(*userInfoDict_);
+  if (frameworkData != nullptr) event.merge(*frameworkData);
+  filterEvent(event);
+}
+
+void HTTPSPostBackend::filterEvent(Dictionary& event) const {
+  EventFilters::Digest digest = [this](const String& text) { return convertIntoSHA256(text); };
+  filters_.filterEvent(event, digest);
+}
+
+}  // namespace kyt
