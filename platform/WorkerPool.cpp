@@ -1,16 +1,312 @@
+// One mutex guards the pool; it is held for moments only. Idle workers sleep each on a condition of its own
+// and are woken last in, first out, so that few stay warm and the others reach their time-out.
 #include "platform/WorkerPool.h"
 
+#include <algorithm>
+#include <atomic>
+#include <cstdio>
+#include <deque>
+#include <map>
+#include <system_error>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "platform/ConditionVariable.h"
+#include "platform/Counters.h"
 #include "platform/Mutex.h"
 #include "platform/SerialQueue.h"
 #include "platform/SpinPause.h"
 
 namespace kyt {
 
-BlockingScope::BlockingScope() : worker_(nullptr) {
-  if (Turn* turn = Turn::current()) turn->handDeferredToExecutors();
+struct WorkerPool::Worker {
+  static thread_local Worker* current;
+  Implementation* pool = nullptr;
+  unsigned number = 0;
+  std::thread thread;
+  ConditionVariable wake;
+  // Guarded by the pool's mutex.
+  bool alive = false;
+  bool woken = false;
+  uint64_t owner = 0;  // of the queue it runs
+  // Its own thread's.
+  const SerialQueue* queue = nullptr;  // what it runs
+  unsigned blockingDepth = 0;
+};
+
+thread_local WorkerPool::Worker* WorkerPool::Worker::current = nullptr;
+
+class WorkerPool::Implementation {
+ public:
+  explicit Implementation(WorkerPoolOptions options) : options_(options) {
+    if (options_.runnable == 0) options_.runnable = std::max(2u, std::thread::hardware_concurrency());
+    options_.maxWorkers = std::max<size_t>(options_.maxWorkers, 1);
+    mostOfOneOwner_ = std::max<size_t>(options_.maxWorkers / 2, 1);
+  }
+
+  void submit(std::shared_ptr<SerialQueue> queue);
+  void shutDown();
+  void block();
+  void unblock();
+  [[nodiscard]] WorkerPoolFigures figures();
+
+ private:
+  using Queues = std::deque<std::shared_ptr<SerialQueue>>;
+
+  void work(Worker& self);
+  bool sleep(Worker& self) REQUIRES(mutex_);
+  std::shared_ptr<SerialQueue> take(Worker& self) REQUIRES(mutex_);
+  void release(Worker& self) REQUIRES(mutex_);
+  void countExhausted();
+  [[nodiscard]] bool ownerMayRun(uint64_t owner) REQUIRES(mutex_);
+  [[nodiscard]] Worker* workerToWake() REQUIRES(mutex_);
+  void start() REQUIRES(mutex_);
+
+  WorkerPoolOptions options_;  // constant, like the next
+  size_t mostOfOneOwner_;
+
+  Mutex mutex_;
+  std::vector<std::unique_ptr<Worker>> slots_
+      GUARDED_BY(mutex_);                         // those of workers that ended are used again
+  std::vector<Worker*> idle_ GUARDED_BY(mutex_);  // asleep; the last one is woken first
+  Queues ready_ GUARDED_BY(mutex_);
+  std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their half
+  ConditionVariable allEnded_;
+  std::thread ended_ GUARDED_BY(mutex_);  // the last worker that ended; the next to end joins it
+  size_t workers_ GUARDED_BY(mutex_) = 0;
+  size_t running_ GUARDED_BY(mutex_) = 0;  // neither asleep nor blocked
+  size_t looking_ GUARDED_BY(mutex_) = 0;  // … of which about to look for work
+  size_t blocked_ GUARDED_BY(mutex_) = 0;
+  size_t mostWorkers_ GUARDED_BY(mutex_) = 0;
+  uint64_t wakeUps_ GUARDED_BY(mutex_) = 0;
+  bool stopping_ GUARDED_BY(mutex_) = false;
+};
+
+void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
+  Worker* toWake = nullptr;
+  {
+    MutexLock lock(mutex_);
+    if (!stopping_) {
+      // A queue that its own worker submits has just been left with work: that worker looks for work next.
+      const bool looksNext = Worker::current != nullptr && Worker::current->queue == queue.get();
+      ready_.push_back(std::move(queue));
+      if (!looksNext) toWake = workerToWake();
+    }
+  }
+  if (toWake != nullptr) toWake->wake.notifyOne();
+  if (queue) queue->discardPending();
 }
 
-BlockingScope::~BlockingScope() = default;
+// Counts a sleeping worker as looking and returns it, or starts one, if work waits that no worker would see
+// soon.
+WorkerPool::Worker* WorkerPool::Implementation::workerToWake() {
+  if (ready_.empty() || looking_ > 0 || running_ >= options_.runnable) return nullptr;
+  if (idle_.empty()) {
+    if (workers_ < options_.maxWorkers) {
+      start();
+    } else {
+      countExhausted();
+    }
+    return nullptr;
+  }
+  Worker* worker = idle_.back();
+  idle_.pop_back();
+  worker->woken = true;
+  ++running_;
+  ++looking_;
+  ++wakeUps_;
+  return worker;
+}
+
+void WorkerPool::Implementation::start() {
+  auto found = std::find_if(slots_.begin(), slots_.end(), [](const auto& slot) { return !slot->alive; });
+  if (found == slots_.end()) {
+    slots_.push_back(std::make_unique<Worker>());
+    found = slots_.end() - 1;
+    (*found)->pool = this;
+    (*found)->number = static_cast<unsigned>(slots_.size());
+  }
+  Worker& worker = **found;
+  try {
+    worker.thread = std::thread([this, &worker] { work(worker); });
+  } catch (const std::system_error&) {
+    return;
+  }
+  worker.alive = true;
+  mostWorkers_ = std::max(mostWorkers_, ++workers_);
+  ++running_;
+  ++looking_;
+  ++wakeUps_;
+}
+
+void WorkerPool::Implementation::work(Worker& self) {
+  Worker::current = &self;
+  if (options_.nameThread != nullptr) {
+    char name[16];
+    std::snprintf(name, sizeof name, "%.11s-%u", options_.name, self.number % 1000);
+    options_.nameThread(name);
+  }
+  std::thread ended;
+  mutex_.lock();
+  for (;;) {
+    std::shared_ptr<SerialQueue> queue;
+    if (!stopping_ && running_ <= options_.runnable) queue = take(self);
+    if (!queue) {
+      if (!sleep(self)) break;
+      continue;
+    }
+    --looking_;
+    Worker* next = workerToWake();
+    mutex_.unlock();
+    if (next != nullptr) next->wake.notifyOne();
+    self.queue = queue.get();
+    queue->runPending();
+    self.queue = nullptr;
+    queue.reset();
+    mutex_.lock();
+    release(self);
+    ++looking_;
+  }
+  self.alive = false;
+  if (--workers_ == 0) allEnded_.notifyAll();
+  ended = std::exchange(ended_, std::move(self.thread));
+  mutex_.unlock();
+  if (ended.joinable()) ended.join();
+}
+
+// Until there is work to look for; false when the worker is to end.
+bool WorkerPool::Implementation::sleep(Worker& self) {
+  --looking_;
+  --running_;
+  if (stopping_) return false;
+  self.woken = false;
+  idle_.push_back(&self);
+  const MonotonicTime deadline = std::chrono::steady_clock::now() + options_.idleExit;
+  while (!self.woken)
+    if (!self.wake.waitUntil(mutex_, deadline) && !self.woken) {
+      idle_.erase(std::find(idle_.begin(), idle_.end(), &self));
+      return false;
+    }
+  return true;
+}
+
+std::shared_ptr<SerialQueue> WorkerPool::Implementation::take(Worker& self) {
+  while (!ready_.empty()) {
+    std::shared_ptr<SerialQueue> queue = std::move(ready_.front());
+    ready_.pop_front();
+    if (ownerMayRun(queue->owner())) {
+      self.owner = queue->owner();
+      return queue;
+    }
+    countExhausted();
+    parked_[queue->owner()].push_back(std::move(queue));
+  }
+  return nullptr;
+}
+
+bool WorkerPool::Implementation::ownerMayRun(uint64_t owner) {
+  if (owner == 0 || running_ + blocked_ - looking_ < mostOfOneOwner_) return true;
+  const auto held = std::count_if(slots_.begin(), slots_.end(),
+                                  [owner](const auto& slot) { return slot->alive && slot->owner == owner; });
+  return static_cast<size_t>(held) < mostOfOneOwner_;
+}
+
+// The worker has run its queue. One that waited for a worker of this owner is next in line again.
+void WorkerPool::Implementation::release(Worker& self) {
+  const uint64_t owner = std::exchange(self.owner, 0);
+  if (owner == 0 || parked_.empty()) return;
+  const auto found = parked_.find(owner);
+  if (found == parked_.end()) return;
+  ready_.push_front(std::move(found->second.front()));
+  found->second.pop_front();
+  if (found->second.empty()) parked_.erase(found);
+}
+
+void WorkerPool::Implementation::countExhausted() {
+  if (options_.counters != nullptr) options_.counters->add(Reason::workersExhausted);
+}
+
+void WorkerPool::Implementation::block() {
+  Worker* toWake;
+  {
+    MutexLock lock(mutex_);
+    --running_;
+    ++blocked_;
+    toWake = workerToWake();
+  }
+  if (toWake != nullptr) toWake->wake.notifyOne();
+}
+
+void WorkerPool::Implementation::unblock() {
+  MutexLock lock(mutex_);
+  --blocked_;
+  ++running_;
+}
+
+void WorkerPool::Implementation::shutDown() {
+  std::vector<Worker*> sleepers;
+  {
+    MutexLock lock(mutex_);
+    stopping_ = true;
+    sleepers.swap(idle_);
+    for (Worker* worker : sleepers) worker->woken = true;
+    running_ += sleepers.size();
+    looking_ += sleepers.size();
+  }
+  for (Worker* worker : sleepers) worker->wake.notifyOne();
+  std::thread last;
+  Queues pending;
+  {
+    MutexLock lock(mutex_);
+    while (workers_ > 0) allEnded_.wait(mutex_);
+    last = std::move(ended_);
+    pending.swap(ready_);
+    for (auto& [owner, queues] : parked_)
+      pending.insert(pending.end(), std::make_move_iterator(queues.begin()),
+                     std::make_move_iterator(queues.end()));
+    parked_.clear();
+  }
+  if (last.joinable()) last.join();  // it has joined the one that ended before it, and so on
+  for (const std::shared_ptr<SerialQueue>& queue : pending) queue->discardPending();
+}
+
+WorkerPoolFigures WorkerPool::Implementation::figures() {
+  MutexLock lock(mutex_);
+  WorkerPoolFigures figures;
+  figures.workers = workers_;
+  figures.idle = idle_.size();
+  figures.blocked = blocked_;
+  figures.waitingQueues = ready_.size();
+  for (const auto& [owner, queues] : parked_) figures.waitingQueues += queues.size();
+  figures.mostWorkers = mostWorkers_;
+  figures.wakeUps = wakeUps_;
+  return figures;
+}
+
+WorkerPool::WorkerPool(WorkerPoolOptions options)
+    : implementation_(std::make_unique<Implementation>(options)) {}
+WorkerPool::~WorkerPool() {
+  shutDown();
+}
+void WorkerPool::submit(std::shared_ptr<SerialQueue> queue) {
+  implementation_->submit(std::move(queue));
+}
+void WorkerPool::shutDown() {
+  implementation_->shutDown();
+}
+WorkerPoolFigures WorkerPool::figures() const {
+  return implementation_->figures();
+}
+
+BlockingScope::BlockingScope() : worker_(WorkerPool::Worker::current) {
+  if (Turn* turn = Turn::current()) turn->handDeferredToExecutors();
+  if (worker_ != nullptr && worker_->blockingDepth++ == 0) worker_->pool->block();
+}
+
+BlockingScope::~BlockingScope() {
+  if (worker_ != nullptr && --worker_->blockingDepth == 0) worker_->pool->unblock();
+}
 
 void Monitor::lock() {
   for (int spin = 0; spin < 40; ++spin) {  // most holders are done within a microsecond

@@ -1,13 +1,18 @@
 // The elastic worker pool: the threads that run serial queues.
 //
-// Several operations block by design (a storebag download, uploads, the wait for the agent's monitor while it is held
-// by a download). A worker announces that with a BlockingScope, and the pool then keeps enough others running. At
-// most `Limits::maxWorkers` threads exist; the queues of one owner occupy at most half of them; work past that waits,
-// counted. Idle workers end after a while, the last one stays only while work was seen recently, so an idle daemon has
-// no wake-ups.
+// Several operations block by design (a storebag download, uploads, the wait for the agent's monitor while it
+// is held by a download). A worker announces that with a BlockingScope, and the pool then keeps enough others
+// running. At most `Limits::maxWorkers` threads exist; the queues of one owner occupy at most half of them;
+// work past that waits, counted. Idle workers end after a while, the last one too, so an idle daemon has no
+// wake-ups.
+//
+// Queues run in the order of their submission. A submission wakes a worker only when fewer than `runnable`
+// run and none of them is just about to look for work; a worker that takes one queue and leaves others wakes
+// the next. A worker that the system refuses to start is tried again with the next submission.
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 
 #include "platform/Clock.h"
@@ -15,16 +20,20 @@
 
 namespace kyt {
 
+class Counters;
+
 struct WorkerPoolOptions {
-  size_t runnable = 0;      // workers that may run without being blocked; 0: the number of processors, at least 2
+  size_t runnable = 0;  // workers that may run without being blocked; 0: the number of processors, at least 2
   size_t maxWorkers = 512;  // threads in all
   Duration idleExit = std::chrono::seconds(10);
-  const char* name = "kyt-worker";             // at most 12 bytes; a number follows
+  const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
   void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
+  Counters* counters = nullptr;  // Reason::workersExhausted, each time a queue must wait for a limit
 };
 
 struct WorkerPoolFigures {
-  size_t workers = 0, blocked = 0, waitingQueues = 0, mostWorkers = 0;
+  size_t workers = 0, idle = 0, blocked = 0, waitingQueues = 0, mostWorkers = 0;
+  uint64_t wakeUps = 0;  // workers started or woken
 };
 
 class WorkerPool final : public Executor {
@@ -32,18 +41,20 @@ class WorkerPool final : public Executor {
   explicit WorkerPool(WorkerPoolOptions options);
   ~WorkerPool() override;  // shutDown()
   void submit(std::shared_ptr<SerialQueue> queue) override;
-  // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a worker.
+  // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a
+  // worker.
   void shutDown();
   [[nodiscard]] WorkerPoolFigures figures() const;
 
  private:
   friend class BlockingScope;
+  struct Worker;
   class Implementation;
   std::unique_ptr<Implementation> implementation_;
 };
 
-// Announces that this thread is about to wait for something that takes long. No effect on threads that are no workers.
-// Before it waits, whatever this thread's turn deferred is handed to the executors.
+// Announces that this thread is about to wait for something that takes long. No effect on threads that are no
+// workers. Before it waits, whatever this thread's turn deferred is handed to the executors.
 class BlockingScope {
  public:
   BlockingScope();
@@ -52,7 +63,7 @@ class BlockingScope {
   BlockingScope& operator=(const BlockingScope&) = delete;
 
  private:
-  void* worker_;
+  WorkerPool::Worker* worker_;
 };
 
 }  // namespace kyt
