@@ -33,7 +33,8 @@ namespace kyt {
 
 class ReportingSessionConnectivityHelper;
 
-class ReportingdSession final : public ClientSessionInterface {
+class ReportingdSession final : public ClientSessionInterface,
+                                public std::enable_shared_from_this<ReportingdSession> {
  public:
   // Never fails. The delegate and the class outlive the session; the connection is held until dealloc().
   [[nodiscard]] static std::shared_ptr<ReportingdSession> initWithSessionDelegate(
@@ -79,6 +80,10 @@ class ReportingdSession final : public ClientSessionInterface {
   [[nodiscard]] std::optional<String> hierarchyToken() const;
   // The agent refused the session's hierarchy token: it has none from now on.
   void becomeStandalone();
+  // For the agent's lists, which own their sessions.
+  [[nodiscard]] std::shared_ptr<ReportingdSession> shared() { return shared_from_this(); }
+  // None after dealloc().
+  [[nodiscard]] const std::shared_ptr<Connection>& connection() const { return _connection; }
   [[nodiscard]] uint32_t sessionID() const { return _sessionID; }
   void setSessionID(uint32_t sessionID) { _sessionID = sessionID; }
   [[nodiscard]] const std::optional<Dictionary>& sessionInfo() const { return _sessionInfo; }

@@ -1,0 +1,47 @@
+// The sessions that carry one hierarchy token, in the order of their registration. A level is a number that a
+// client chose, up to 2^32-1, so look-ups go over the levels that sessions hold and never count through them.
+// Used by the agent alone, which holds its monitor.
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <utility>
+
+namespace kyt {
+
+class ReportingdSession;
+
+class HierarchyGroup {
+ public:
+  using Session = std::shared_ptr<ReportingdSession>;
+
+  // At the end, under the session's present level. Returns the place in the order, the session's handle here.
+  uint64_t append(Session session);
+  void remove(uint64_t place);
+  // The session at `place` has changed its level. It keeps its place.
+  void relevel(uint64_t place);
+
+  [[nodiscard]] bool contains(uint64_t place) const { return inOrder_.count(place) != 0; }
+  [[nodiscard]] bool empty() const { return inOrder_.empty(); }
+  [[nodiscard]] size_t size() const { return inOrder_.size(); }
+  // The first in order whose level that is, or null.
+  [[nodiscard]] Session getFirstSessionWithHierarchy(uint32_t level) const;
+  // Of the levels below `level`, lowest first, the first session that aggregates; only the first session of
+  // each level counts.
+  [[nodiscard]] Session firstAggregatorBelow(uint32_t level) const;
+  // (place, session), in order. The group must not change during an enumeration.
+  struct Member {
+    Session session;
+    uint32_t level;
+  };
+  [[nodiscard]] auto begin() const { return inOrder_.begin(); }
+  [[nodiscard]] auto end() const { return inOrder_.end(); }
+
+ private:
+  uint64_t nextPlace_ = 1;
+  std::map<uint64_t, Member> inOrder_;
+  std::map<std::pair<uint32_t, uint64_t>, ReportingdSession*> byLevel_;  // (level, place)
+};
+
+}  // namespace kyt

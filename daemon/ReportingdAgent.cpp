@@ -1,0 +1,130 @@
+// Connections and the list of live sessions.
+#include "daemon/ReportingdAgent.h"
+
+#include <algorithm>
+#include <chrono>
+#include <utility>
+
+#include "platform/Keys.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/System.h"
+#include "session/ReportingdSession.h"
+
+namespace kyt {
+
+ReportingdAgent::ReportingdAgent(Configuration configuration, StorebagFetcher& fetcher,
+                                 ReportingdSessionClass& sessionClass, ProcessTransaction& transaction)
+    : configuration_(configuration),
+      fetcher_(fetcher),
+      class_(sessionClass),
+      transaction_(transaction),
+      _sharedData(configuration.platform.limits.maxSharedDataBytesPerUser) {}
+
+ReportingdAgent::~ReportingdAgent() = default;
+
+std::string ReportingdAgent::description() const {
+  return "<ReportingdAgent>";
+}
+
+bool ReportingdAgent::listenerShouldAcceptNewConnection(Listener& /*listener*/,
+                                                        const std::shared_ptr<Connection>& connection) {
+  Log& log = configuration_.platform.log;
+  if (stopping_) return false;
+  if (!connection->entitlementValue(kEntitlement).boolValue()) {
+    log.debug(
+        "listener: new VRP connection %s does not have required kytreporting entitlement. Closing connection...",
+        connection->description().c_str());
+    return false;
+  }
+  log.debug("listener: Accepting new VRP connection %s as it has proper entitlement, %d(%d) connections.",
+            connection->description().c_str(), static_cast<int>(sessionCount()),
+            static_cast<int>(hierarchyTokenCount()));
+
+  const std::shared_ptr<ReportingdSession> session = createReportingSessionWithDelegate(*this, connection);
+  connection->setExportedObject(session);
+  // Both handlers show the session's description and not the connection's, deliberately: the lines of one
+  // session are found by it. The connection drops the handlers after the invalidation, and with them its hold
+  // on the session.
+  connection->setInterruptionHandler([&log, session] {
+    log.debug("listener: VRP connection to %s was interrupted", session->description().c_str());
+  });
+  connection->setInvalidationHandler([this, session] { sessionWasInvalidated(session); });
+  connection->resume();
+  // A shut-down that began meanwhile may have looked at the list before this session stood in it.
+  if (stopping_) connection->finish();
+  return true;
+}
+
+std::shared_ptr<ReportingdSession> ReportingdAgent::createReportingSessionWithDelegate(
+    ReportingdSessionDelegate& delegate, const std::shared_ptr<Connection>& connection) {
+  std::shared_ptr<ReportingdSession> session =
+      ReportingdSession::initWithSessionDelegate(delegate, connection, class_);
+  {
+    MutexLock lock(endMutex_);
+    ++unendedSessions_;
+  }
+  MonitorLock lock(monitor_);
+  if (_sessionList.empty() && !transactionOpen_) {
+    transaction_.begin();
+    transactionOpen_ = true;
+  }
+  _sessionList.push_back(session);
+  sessionCount_.store(_sessionList.size(), std::memory_order_relaxed);
+  return session;
+}
+
+void ReportingdAgent::sessionWasInvalidated(const std::shared_ptr<ReportingdSession>& session) {
+  configuration_.platform.log.debug("listener: VRP connection to %s was invalidated",
+                                    session->description().c_str());
+  invalidateReportingSession(session);
+  session->dealloc();
+  // Notified while locked: the shut-down that waits for this destroys the agent next.
+  MutexLock lock(endMutex_);
+  --unendedSessions_;
+  ended_.notify_all();
+}
+
+void ReportingdAgent::invalidateReportingSession(const std::shared_ptr<ReportingdSession>& session) {
+  MonitorLock lock(monitor_);
+  const std::optional<String> token = session->hierarchyToken();
+  // From where it is registered, which is the array of an earlier token when the client dropped its token
+  // later.
+  removeFromGroups(*session);
+  // The count is that of all tokens and not of this one's sessions, deliberately. While the token's own entry
+  // exists it is never zero, so a token's array and shared data stay for the life of the process: sessions of
+  // one hierarchy may come and go without losing what they share.
+  if (token && _correlatedSessions.count(token->view()) != 0 && _correlatedSessions.empty()) {
+    _correlatedSessions.erase(token->str());
+    _sharedData.removeToken(*token);
+  }
+  const auto listed = std::find(_sessionList.begin(), _sessionList.end(), session);
+  if (listed != _sessionList.end()) _sessionList.erase(listed);
+  sessionCount_.store(_sessionList.size(), std::memory_order_relaxed);
+  if (_sessionList.empty() && transactionOpen_) {
+    transactionOpen_ = false;
+    transaction_.end();
+  }
+}
+
+void ReportingdAgent::finishAllSessions() {
+  std::vector<std::shared_ptr<Connection>> connections;
+  stopping_ = true;
+  {
+    MonitorLock lock(monitor_);
+    connections.reserve(_sessionList.size());
+    for (const auto& session : _sessionList) connections.push_back(session->connection());
+  }
+  for (const auto& connection : connections)
+    if (connection != nullptr) connection->finish();
+}
+
+// The condition variable takes the native mutex, which the analysis does not see.
+bool ReportingdAgent::waitUntilSessionsHaveEnded(Duration timeout) NO_THREAD_SAFETY_ANALYSIS {
+  std::unique_lock<std::mutex> lock(endMutex_.native());
+  const auto haveEnded = [this]() NO_THREAD_SAFETY_ANALYSIS { return unendedSessions_ == 0; };
+  return ended_.wait_for(lock, timeout, haveEnded);
+}
+
+}  // namespace kyt
