@@ -316,10 +316,16 @@ void Turn::runDeferred() {
 
 void Turn::handDeferredToExecutors() {
   if (!outermost_) return currentTurn->handDeferredToExecutors();
+  if (beforeBlocking_) beforeBlocking_();
   while (std::shared_ptr<SerialQueue> queue = takeFirst()) {
     Executor& executor = queue->executor_;
     executor.submit(std::move(queue));
   }
+}
+
+void Turn::setBeforeBlocking(Task task) {
+  if (!outermost_) return currentTurn->setBeforeBlocking(std::move(task));
+  beforeBlocking_ = std::move(task);
 }
 
 }  // namespace kyt

@@ -112,7 +112,11 @@ class Turn {
   Turn& operator=(const Turn&) = delete;
   void runDeferred();
   static Turn* current() noexcept;  // the outermost one of this thread; null outside
+  // Also calls what setBeforeBlocking() was given, so that nobody waits for what this turn holds back.
   void handDeferredToExecutors();
+  // Called on this thread whenever the outermost turn is about to block, until it is set again (empty: nothing).
+  // A connection sends the replies that it gathers for one write.
+  void setBeforeBlocking(Task task);
 
  private:
   friend class SerialQueue;
@@ -123,6 +127,7 @@ class Turn {
   size_t first_ = 0, end_ = 0;  // what is left to run of near_ with far_ behind it
   std::array<std::shared_ptr<SerialQueue>, 6> near_;
   std::vector<std::shared_ptr<SerialQueue>> far_;
+  Task beforeBlocking_;
 };
 
 }  // namespace kyt
