@@ -1,0 +1,142 @@
+#include "client/Loop.h"
+
+#include <algorithm>
+#include <mutex>
+
+namespace kyt::client {
+
+namespace {
+
+using std::chrono::milliseconds;
+using Steady = std::chrono::steady_clock;
+
+constexpr milliseconds kLookInterval{1};  // while messages flow
+constexpr milliseconds kQuietAfter{20};   // no message for so long: sleep until woken
+
+std::atomic<Loop*> currentLoop{nullptr};
+std::once_flag forkHandlersInstalled;
+thread_local const Loop* threadLoop = nullptr;
+
+}  // namespace
+
+Loop* Loop::current() {
+  std::call_once(forkHandlersInstalled, installForkHandlers);
+  Loop* loop = currentLoop.load();
+  if (loop != nullptr) return loop;
+  auto* made =
+      new Loop;  // never destroyed: the thread and forked children may need it until the process ends
+  if (currentLoop.compare_exchange_strong(loop, made)) return made;
+  delete made;
+  return loop;
+}
+
+void Loop::installForkHandlers() {
+  linux_client::atFork(
+      []() NO_THREAD_SAFETY_ANALYSIS {
+        if (Loop* loop = currentLoop.load()) loop->mutex_.lock();
+      },
+      []() NO_THREAD_SAFETY_ANALYSIS {
+        if (Loop* loop = currentLoop.load()) loop->mutex_.unlock();
+      },
+      []() NO_THREAD_SAFETY_ANALYSIS {
+        // The parent's connections stay the parent's: this process has none of the threads that would serve
+        // them.
+        Loop* loop = currentLoop.exchange(nullptr);
+        if (loop == nullptr) return;
+        for (const auto& session : loop->sessions_) session->becomeInert();
+        loop->mutex_.unlock();
+      });
+}
+
+bool Loop::isCurrentThread() const {
+  return threadLoop == this;
+}
+
+void Loop::add(std::shared_ptr<Session> session) {
+  bool start = false;
+  {
+    MutexLock lock(mutex_);
+    sessions_.push_back(session);
+    start = !running_;
+    running_ = true;
+  }
+  if (!start) {
+    wakeUp_.wake();
+    return;
+  }
+  if (linux_client::startThread(
+          "kytreporting", [](void* loop) { static_cast<Loop*>(loop)->run(); }, this))
+    return;
+  MutexLock lock(mutex_);
+  running_ = false;
+  std::erase(sessions_, session);
+  session->becomeInert();
+}
+
+void Loop::noticeWork() {
+  std::atomic_thread_fence(std::memory_order_seq_cst);
+  if (sleeping_.load(std::memory_order_relaxed) && sleeping_.exchange(false)) wakeUp_.wake();
+}
+
+bool Loop::turn(std::vector<std::shared_ptr<Session>>& sessions) {
+  bool active = false;
+  const SteadyTime now = Steady::now();
+  for (const auto& session : sessions) active |= session->pump(now);
+  return active;
+}
+
+milliseconds Loop::timeout(const std::vector<std::shared_ptr<Session>>& sessions, bool active) const {
+  if (active) return kLookInterval;
+  milliseconds timeout{-1};
+  const SteadyTime now = Steady::now();
+  for (const auto& session : sessions) {
+    const auto deadline = session->nextDeadline();
+    if (!deadline) continue;
+    const auto left = std::max(std::chrono::ceil<milliseconds>(*deadline - now), milliseconds(0));
+    if (timeout.count() < 0 || left < timeout) timeout = left;
+  }
+  return timeout;
+}
+
+void Loop::run() {
+  threadLoop = this;
+  std::vector<std::shared_ptr<Session>> sessions;
+  linux_client::WaitSet waits;
+  SteadyTime lastActive = Steady::now();
+  for (;;) {
+    {
+      MutexLock lock(mutex_);
+      std::erase_if(sessions_, [](const auto& session) { return session->isDone(); });
+      sessions = sessions_;
+      if (sessions.empty()) {
+        running_ = false;
+        return;
+      }
+    }
+    if (turn(sessions)) lastActive = Steady::now();
+    bool active = Steady::now() - lastActive < kQuietAfter;
+    if (!active) {
+      sleeping_.store(true);
+      std::atomic_thread_fence(std::memory_order_seq_cst);
+      // What was queued before anyone could see that this thread sleeps.
+      active = std::any_of(sessions.begin(), sessions.end(),
+                           [](const auto& session) { return session->hasWork(); });
+    }
+    if (std::any_of(sessions.begin(), sessions.end(), [](const auto& session) { return session->isDone(); }))
+      continue;
+    waits.clear();
+    const size_t wakeIndex = waits.add(wakeUp_.fd(), false);
+    std::vector<std::pair<size_t, Session*>> indexes;
+    for (const auto& session : sessions)
+      if (session->fd() >= 0)
+        indexes.emplace_back(waits.add(session->fd(), session->wantsToWrite()), session.get());
+    waits.wait(timeout(sessions, active));
+    sleeping_.store(false);
+    if (waits.ready(wakeIndex)) wakeUp_.clear();
+    const SteadyTime now = Steady::now();
+    for (const auto& [index, session] : indexes)
+      if (waits.ready(index) && session->fd() >= 0) session->readable(now);
+  }
+}
+
+}  // namespace kyt::client

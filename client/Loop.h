@@ -1,0 +1,46 @@
+// The library's thread: one for the process, started with the first session, ended with the last. It waits
+// for all sessions' sockets at once.
+//
+// While messages flow it looks at the queues every millisecond by itself, so that reporting needs no system
+// call and the messages of a millisecond leave in one write; after a pause it sleeps until the next message
+// wakes it. A Loop is never destroyed (a process may end while it runs); a forked child gets a new one.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <vector>
+
+#include "client/Session.h"
+#include "platform/Mutex.h"
+#include "platform/linux/client/ClientSocket.h"
+
+namespace kyt::client {
+
+class Loop {
+ public:
+  // The process's loop.
+  static Loop* current();
+
+  void add(std::shared_ptr<Session> session);
+  // After something was queued: wakes the thread only if it sleeps.
+  void noticeWork();
+  // Wakes it whatever it does: a session was closed.
+  void wake() { wakeUp_.wake(); }
+  [[nodiscard]] bool isCurrentThread() const;
+
+ private:
+  Loop() = default;
+  void run();
+  bool turn(std::vector<std::shared_ptr<Session>>& sessions);
+  [[nodiscard]] std::chrono::milliseconds timeout(const std::vector<std::shared_ptr<Session>>& sessions,
+                                                  bool active) const;
+  static void installForkHandlers();
+
+  linux_client::WakeUp wakeUp_;
+  std::atomic<bool> sleeping_{false};
+  Mutex mutex_;
+  std::vector<std::shared_ptr<Session>> sessions_ GUARDED_BY(mutex_);
+  bool running_ GUARDED_BY(mutex_) = false;
+};
+
+}  // namespace kyt::client

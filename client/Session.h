@@ -1,0 +1,152 @@
+// One session of the client library: the queue that the program's threads fill, and the connection that the
+// library's thread keeps for it. What must survive the daemon's death (session and user information, whether
+// the session was configured, shared data, digest key) is kept here and replayed on each new connection.
+//
+// Threads: the operations under "any thread" only touch the ring, atomics and the overflow list; everything
+// else belongs to the library's thread (Loop).
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <deque>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "client/Command.h"
+#include "client/MessageRing.h"
+#include "platform/Mutex.h"
+#include "platform/ipc/Handshake.h"
+#include "platform/linux/client/ClientSocket.h"
+
+namespace kyt {
+struct Message;
+}
+
+namespace kyt::client {
+
+class Loop;
+
+using SteadyTime = std::chrono::steady_clock::time_point;
+
+class Session {
+ public:
+  Session(KYTReporting::Options options, Loop* loop, bool single);
+  ~Session();
+  Session(const Session&) = delete;
+  Session& operator=(const Session&) = delete;
+
+  // Any thread.
+  bool enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payload, uint32_t flag);
+  void enqueueCommand(std::unique_ptr<Command> command);
+  [[nodiscard]] KYTReporting::Statistics statistics() const;
+  // Says goodbye and waits; whether the daemon has taken everything. On the library's thread it does not
+  // wait.
+  bool finishAndWait(std::chrono::milliseconds timeout);
+  // Nothing runs for this session any more once it has returned (on the library's thread: once the running
+  // completion has). Safe to call twice.
+  void close();
+  [[nodiscard]] bool isInert() const { return inert_.load(std::memory_order_relaxed); }
+
+  // The library's thread, or a child process just forked.
+  void becomeInert();
+
+  // The library's thread: moves everything that can be moved now; whether anything was. False from isDone()
+  // on.
+  bool pump(SteadyTime now);
+  void readable(SteadyTime now);
+  [[nodiscard]] bool hasWork() const;
+  [[nodiscard]] bool isDone() const { return done_; }
+  [[nodiscard]] int fd() const { return socket_.fd(); }
+  [[nodiscard]] bool wantsToWrite() const { return outAt_ < out_.size(); }
+  // When pump() has something to do without being told, or none.
+  [[nodiscard]] std::optional<SteadyTime> nextDeadline() const;
+  void end(ClientError code, const char* reason);  // every completion runs
+
+ private:
+  struct Item {
+    uint16_t category = 0, type = 0;
+    uint32_t flag = 0;
+    uint32_t bytes = 0;  // what it counts for in queuedBytes_
+    Dictionary payload;
+    std::unique_ptr<Command> command;
+  };
+  struct Pending {
+    uint32_t serial = 0;
+    std::unique_ptr<Command> command;
+  };
+  struct Mark {  // descriptors that leave with the byte at this offset of out_
+    size_t offset = 0;
+    std::vector<int> descriptors;
+  };
+
+  void noticeWork();
+  void connect(SteadyTime now);
+  void disconnected(SteadyTime now, const char* reason);
+  void replay();
+  bool drain();
+  bool nextItem(Item& item);
+  bool write(SteadyTime now);
+  void pingIfDue(SteadyTime now);
+  void handle(const Message& message);
+  void handleReply(const Message& message);
+  void handleCall(const Message& message);
+  void acknowledge(uint32_t serial);
+
+  // Encoding (Encoding.cpp): each appends one call to out_; false when it cannot be encoded.
+  bool encodeMessage(const Item& item);
+  bool encodeCommand(Command& command, uint32_t serial);
+  bool encodeSessionInfo();
+  static void complete(Command& command, const Message& message);
+
+  // Constant.
+  const std::string path_;
+  const bool single_;
+  const size_t maxQueuedBytes_;
+  Loop* const loop_;
+
+  // Any thread.
+  MessageRing<Item> ring_;
+  std::atomic<size_t> queuedBytes_{0};
+  std::atomic<bool> closed_{false}, inert_{false}, connected_{false};
+  std::atomic<uint64_t> sent_{0}, droppedQueueFull_{0}, lost_{0}, droppedClosed_{0}, droppedInvalid_{0},
+      connections_{0};
+  Mutex overflowMutex_;
+  std::deque<std::unique_ptr<Command>> overflow_
+      GUARDED_BY(overflowMutex_);  // commands that found the ring full
+  std::atomic<size_t> overflowed_{0};
+  Mutex stateMutex_;
+  std::condition_variable stateChanged_;
+  bool finished_ GUARDED_BY(stateMutex_) = false;     // the goodbye was answered
+  bool goodbyeOver_ GUARDED_BY(stateMutex_) = false;  // answered or failed
+  bool ended_ GUARDED_BY(stateMutex_) = false;        // nothing runs any more
+
+  // The library's thread.
+  Dictionary sessionInfo_;
+  std::optional<Dictionary> userInfo_;
+  Value frameworks_;
+  Function<void(const AggregatedMessage&)> aggregationBlock_;
+  bool configured_ = false;
+  Dictionary sharedData_;
+  std::optional<Data> digestKey_;
+  int32_t digestAlgorithm_ = 0;
+  linux_client::ClientSocket socket_;
+  ClientHandshake handshake_;
+  bool handshakeDone_ = false, ending_ = false, done_ = false;
+  std::string in_, out_;
+  size_t outAt_ = 0;
+  std::deque<Mark> marks_;
+  std::deque<Pending> pending_;
+  uint32_t serial_ = 0;
+  struct Unacknowledged {
+    uint32_t serial;
+    uint32_t count;
+  };
+  std::deque<Unacknowledged> unacknowledged_;  // messages by the serial up to which they go
+  bool pingOutstanding_ = false;
+  SteadyTime lastPing_{}, nextAttempt_{};
+  std::chrono::milliseconds backoff_{0};
+};
+
+}  // namespace kyt::client

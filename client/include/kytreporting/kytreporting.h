@@ -1,0 +1,112 @@
+/* libkytreporting: reporting events to kytreportingd from C, and from every language that can call C.
+ *
+ * The same library as <kytreporting/KYTReporting.h>, with the same promises: nothing blocks the caller on the
+ * daemon or the network; what does not fit into the bounded queue is dropped and counted; a daemon that dies
+ * and returns is connected again. Callbacks run on the library's thread, one at a time, each exactly once;
+ * they must not block.
+ *
+ * Strings are UTF-8 and NUL-terminated and are copied. Objects made by kyt_..._new are owned by the caller
+ * until they are freed or taken by a function that says so. Functions that answer int answer 1 for yes and 0
+ * for no. A null session, dictionary or key is an error of the caller that is answered with 0 or nothing.
+ */
+#ifndef KYTREPORTING_H
+#define KYTREPORTING_H
+
+#include <stddef.h>
+#include <stdint.h>
+
+#if defined(__GNUC__)
+#define KYT_API __attribute__((visibility("default")))
+#else
+#define KYT_API
+#endif
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+typedef struct kyt_dictionary kyt_dictionary;
+typedef struct kyt_session kyt_session;
+
+/* Dictionaries: keys in the order in which they were first set; setting a key again replaces its value. */
+KYT_API kyt_dictionary* kyt_dictionary_new(void);
+KYT_API void kyt_dictionary_free(kyt_dictionary* dictionary);
+KYT_API void kyt_dictionary_set_string(kyt_dictionary* dictionary, const char* key, const char* value);
+KYT_API void kyt_dictionary_set_int(kyt_dictionary* dictionary, const char* key, int64_t value);
+KYT_API void kyt_dictionary_set_uint(kyt_dictionary* dictionary, const char* key, uint64_t value);
+KYT_API void kyt_dictionary_set_double(kyt_dictionary* dictionary, const char* key, double value);
+KYT_API void kyt_dictionary_set_bool(kyt_dictionary* dictionary, const char* key, int value);
+/* Seconds since 1970. */
+KYT_API void kyt_dictionary_set_date(kyt_dictionary* dictionary, const char* key, double seconds);
+KYT_API void kyt_dictionary_set_data(kyt_dictionary* dictionary, const char* key, const void* bytes,
+                                     size_t length);
+/* The value stays the caller's; later changes of it do not reach `dictionary`. */
+KYT_API void kyt_dictionary_set_dictionary(kyt_dictionary* dictionary, const char* key,
+                                           const kyt_dictionary* value);
+KYT_API void kyt_dictionary_remove(kyt_dictionary* dictionary, const char* key);
+KYT_API size_t kyt_dictionary_count(const kyt_dictionary* dictionary);
+/* The text of a string value, or null; valid until the dictionary changes. */
+KYT_API const char* kyt_dictionary_get_string(const kyt_dictionary* dictionary, const char* key);
+/* The reading of a number or string value, or `otherwise` when there is none. */
+KYT_API int64_t kyt_dictionary_get_int(const kyt_dictionary* dictionary, const char* key, int64_t otherwise);
+KYT_API double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* key, double otherwise);
+
+/* `error` is null when all went well; otherwise its text. Arguments are valid during the call only. */
+typedef void (*kyt_states_callback)(const char* const* names, size_t count, int has_storebag,
+                                    const char* error, void* context);
+typedef void (*kyt_text_callback)(const char* text, const char* error, void* context);
+/* The last message of an aggregation has no session information, no payload, and zeros. */
+typedef void (*kyt_aggregation_callback)(const kyt_dictionary* session_info, double timestamp,
+                                         uint16_t category, uint16_t type, const kyt_dictionary* payload,
+                                         void* context);
+
+typedef struct kyt_options {
+  size_t size;                          /* sizeof(kyt_options): how the library knows which fields exist */
+  const char* socket_path;              /* null: as usual */
+  const kyt_dictionary* session_info;   /* "SessionID", "ClientType", "ClientVersion", "BatchEvent", ... */
+  const kyt_dictionary* user_info;      /* "ClientName", "ServiceName", ...; null: none */
+  kyt_aggregation_callback aggregation; /* null: the session does not aggregate */
+  void* aggregation_context;
+  size_t max_queued_messages; /* 0: the default, 4096 */
+  size_t max_queued_bytes;    /* 0: the default, 4 MiB */
+} kyt_options;
+
+/* Null only for missing options. */
+KYT_API kyt_session* kyt_session_open(const kyt_options* options);
+/* What was queued and not sent is lost; finish first to keep it. No callback runs after it has returned. */
+KYT_API void kyt_session_close(kyt_session* session);
+/* Sends what is queued, says goodbye, waits at most so many milliseconds; whether all was sent. */
+KYT_API int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds);
+
+KYT_API void kyt_session_configure(kyt_session* session, kyt_states_callback callback, void* context);
+/* New user information; null: as it was. */
+KYT_API void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary* user_info,
+                                      kyt_states_callback callback, void* context);
+/* Whether the message was taken. `payload` may be null and stays the caller's. Flags: 1 realtime, 2 expedite,
+ * 3 both. */
+KYT_API int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type,
+                             const kyt_dictionary* payload, uint32_t flag);
+/* The callback gets the text of what was posted (or null), or the first error. */
+KYT_API void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* context);
+KYT_API void kyt_session_update_shared_data(kyt_session* session, const kyt_dictionary* entries);
+KYT_API void kyt_session_remove_shared_data(kyt_session* session, const char* key);
+/* Algorithm 0 is HMAC-SHA1. */
+KYT_API void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t length,
+                                        int32_t algorithm);
+
+typedef struct kyt_statistics {
+  uint64_t sent, dropped_queue_full, lost_on_connection_end, dropped_closed, dropped_invalid, connections,
+      queued;
+} kyt_statistics;
+KYT_API void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics);
+
+/* One event without a session of its own; the callback gets "finished", or what went wrong. */
+KYT_API void kyt_send_single_message(const kyt_options* options, uint16_t category, uint16_t type,
+                                     const kyt_dictionary* payload, kyt_text_callback callback,
+                                     void* context);
+
+#ifdef __cplusplus
+}
+#endif
+
+#endif /* KYTREPORTING_H */

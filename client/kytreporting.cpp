@@ -1,0 +1,194 @@
+// The C interface: thin over the C++ one. Nothing thrown leaves it.
+#include "kytreporting/kytreporting.h"
+
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "kytreporting/KYTReporting.h"
+
+struct kyt_dictionary {
+  kyt::Dictionary value;
+};
+
+struct kyt_session {
+  std::unique_ptr<kyt::KYTReporting> reporting;
+};
+
+namespace {
+
+using kyt::Dictionary;
+using kyt::KYTReporting;
+using kyt::Value;
+
+void set(kyt_dictionary* dictionary, const char* key, Value value) {
+  if (dictionary != nullptr && key != nullptr) dictionary->value.set(kyt::String(key), std::move(value));
+}
+
+const Value* find(const kyt_dictionary* dictionary, const char* key) {
+  return dictionary != nullptr && key != nullptr ? dictionary->value.find(key) : nullptr;
+}
+
+std::optional<Dictionary> optional(const kyt_dictionary* dictionary) {
+  if (dictionary == nullptr) return std::nullopt;
+  return dictionary->value;
+}
+
+KYTReporting::Options optionsOf(const kyt_options& given) {
+  kyt_options known{};
+  std::memcpy(&known, &given, given.size < sizeof known ? given.size : sizeof known);
+  KYTReporting::Options options;
+  if (known.socket_path != nullptr) options.socketPath = known.socket_path;
+  if (known.session_info != nullptr) options.sessionInfo = known.session_info->value;
+  options.userInfo = optional(known.user_info);
+  if (known.max_queued_messages != 0) options.maxQueuedMessages = known.max_queued_messages;
+  if (known.max_queued_bytes != 0) options.maxQueuedBytes = known.max_queued_bytes;
+  if (known.aggregation != nullptr) {
+    options.aggregationBlock = [callback = known.aggregation,
+                                context = known.aggregation_context](const kyt::AggregatedMessage& message) {
+      kyt_dictionary info, payload;
+      if (message.sessionInfo) info.value = *message.sessionInfo;
+      if (message.payload) payload.value = *message.payload;
+      callback(message.sessionInfo ? &info : nullptr, message.timestamp, message.category, message.type,
+               message.payload ? &payload : nullptr, context);
+    };
+  }
+  return options;
+}
+
+KYTReporting::StatesCompletion statesCompletion(kyt_states_callback callback, void* context) {
+  if (callback == nullptr) return nullptr;
+  return
+      [callback, context](std::optional<std::vector<std::string>> states, std::optional<kyt::Error> error) {
+        std::vector<const char*> names;
+        if (states)
+          for (const std::string& name : *states) names.push_back(name.c_str());
+        callback(names.data(), names.size(), states ? 1 : 0,
+                 error ? error->localizedDescription.c_str() : nullptr, context);
+      };
+}
+
+}  // namespace
+
+extern "C" {
+
+kyt_dictionary* kyt_dictionary_new(void) {
+  return new (std::nothrow) kyt_dictionary;
+}
+void kyt_dictionary_free(kyt_dictionary* dictionary) {
+  delete dictionary;
+}
+void kyt_dictionary_set_string(kyt_dictionary* dictionary, const char* key, const char* value) {
+  set(dictionary, key, value != nullptr ? Value(value) : Value());
+}
+void kyt_dictionary_set_int(kyt_dictionary* dictionary, const char* key, int64_t value) {
+  set(dictionary, key, value);
+}
+void kyt_dictionary_set_uint(kyt_dictionary* dictionary, const char* key, uint64_t value) {
+  set(dictionary, key, value);
+}
+void kyt_dictionary_set_double(kyt_dictionary* dictionary, const char* key, double value) {
+  set(dictionary, key, value);
+}
+void kyt_dictionary_set_bool(kyt_dictionary* dictionary, const char* key, int value) {
+  set(dictionary, key, Value(value != 0));
+}
+void kyt_dictionary_set_date(kyt_dictionary* dictionary, const char* key, double seconds) {
+  set(dictionary, key, kyt::Date{seconds});
+}
+void kyt_dictionary_set_data(kyt_dictionary* dictionary, const char* key, const void* bytes, size_t length) {
+  if (bytes != nullptr || length == 0)
+    set(dictionary, key, kyt::Data(std::string_view(static_cast<const char*>(bytes), length)));
+}
+void kyt_dictionary_set_dictionary(kyt_dictionary* dictionary, const char* key, const kyt_dictionary* value) {
+  if (value != nullptr) set(dictionary, key, value->value);
+}
+void kyt_dictionary_remove(kyt_dictionary* dictionary, const char* key) {
+  if (dictionary != nullptr && key != nullptr) dictionary->value.remove(key);
+}
+size_t kyt_dictionary_count(const kyt_dictionary* dictionary) {
+  return dictionary != nullptr ? dictionary->value.size() : 0;
+}
+const char* kyt_dictionary_get_string(const kyt_dictionary* dictionary, const char* key) {
+  const Value* value = find(dictionary, key);
+  return value != nullptr && value->isString() ? value->string()->c_str() : nullptr;
+}
+int64_t kyt_dictionary_get_int(const kyt_dictionary* dictionary, const char* key, int64_t otherwise) {
+  const Value* value = find(dictionary, key);
+  return value != nullptr ? value->longLongValue() : otherwise;
+}
+double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* key, double otherwise) {
+  const Value* value = find(dictionary, key);
+  return value != nullptr ? value->doubleValue() : otherwise;
+}
+
+kyt_session* kyt_session_open(const kyt_options* options) {
+  if (options == nullptr || options->size == 0) return nullptr;
+  return new kyt_session{KYTReporting::open(optionsOf(*options))};
+}
+void kyt_session_close(kyt_session* session) {
+  delete session;
+}
+int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds) {
+  return session != nullptr && session->reporting->finish(std::chrono::milliseconds(timeout_milliseconds))
+             ? 1
+             : 0;
+}
+void kyt_session_configure(kyt_session* session, kyt_states_callback callback, void* context) {
+  if (session != nullptr) session->reporting->startConfiguration(statesCompletion(callback, context));
+}
+void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary* user_info,
+                              kyt_states_callback callback, void* context) {
+  if (session != nullptr)
+    session->reporting->fetchStates(optional(user_info), statesCompletion(callback, context));
+}
+int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type, const kyt_dictionary* payload,
+                     uint32_t flag) {
+  if (session == nullptr) return 0;
+  return session->reporting->sendMessage(category, type, payload != nullptr ? payload->value : Dictionary(),
+                                         flag)
+             ? 1
+             : 0;
+}
+void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* context) {
+  if (session == nullptr) return;
+  if (callback == nullptr) {
+    session->reporting->flush();
+    return;
+  }
+  session->reporting->flush([callback, context](Value result, std::optional<kyt::Error> error) {
+    const std::string text = kyt::description(result);
+    callback(result.isNull() ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr,
+             context);
+  });
+}
+void kyt_session_update_shared_data(kyt_session* session, const kyt_dictionary* entries) {
+  if (session != nullptr && entries != nullptr) session->reporting->updateSharedData(entries->value);
+}
+void kyt_session_remove_shared_data(kyt_session* session, const char* key) {
+  if (session != nullptr && key != nullptr) session->reporting->updateSharedData(kyt::String(key), Value());
+}
+void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t length, int32_t algorithm) {
+  if (session != nullptr && bytes != nullptr)
+    session->reporting->setDigestKey(kyt::Data(std::string_view(static_cast<const char*>(bytes), length)),
+                                     algorithm);
+}
+void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics) {
+  if (session == nullptr || statistics == nullptr) return;
+  const KYTReporting::Statistics figures = session->reporting->statistics();
+  *statistics = {figures.sent,          figures.droppedQueueFull, figures.lostOnConnectionEnd,
+                 figures.droppedClosed, figures.droppedInvalid,   figures.connections,
+                 figures.queued};
+}
+void kyt_send_single_message(const kyt_options* options, uint16_t category, uint16_t type,
+                             const kyt_dictionary* payload, kyt_text_callback callback, void* context) {
+  if (options == nullptr || options->size == 0) return;
+  KYTReporting::sendSingleMessage(optionsOf(*options), category, type, optional(payload),
+                                  [callback, context](std::string text, std::optional<kyt::Error> error) {
+                                    if (callback == nullptr) return;
+                                    callback(error ? nullptr : text.c_str(),
+                                             error ? error->localizedDescription.c_str() : nullptr, context);
+                                  });
+}
+
+}  // extern "C"
