@@ -1,0 +1,62 @@
+// The platform of tests: clocks, timers, queues, randomness, files and the network are fakes that a test
+// moves by hand; what is only computation (digests, property lists, JSON, deflate, the allocator's sizes) is
+// the real thing. Change fields before the code under test reads them.
+#pragma once
+
+#include "config/Configuration.h"
+#include "config/DeviceIdentity.h"
+#include "config/Environment.h"
+#include "platform/Counters.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/fake/FakeBundle.h"
+#include "platform/fake/FakeConsent.h"
+#include "platform/fake/FakeDeviceProperties.h"
+#include "platform/fake/FakeUrlSession.h"
+#include "platform/fake/FakeUserDefaults.h"
+#include "platform/fake/FixedRandom.h"
+#include "platform/fake/ManualClock.h"
+#include "platform/fake/ManualExecutor.h"
+#include "platform/fake/ManualTimers.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "platform/linux/LinuxMemoryInfo.h"
+#include "platform/linux/OpenSSLCryptography.h"
+#include "platform/linux/PugixmlPropertyLists.h"
+#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/ZlibDeflate.h"
+
+namespace kyt {
+
+struct TestPlatform {
+  Limits limits;
+  Counters counters;
+  MemoryLogSink sink;
+  Log log{sink, LogLevel::debug};
+  ManualClock clock;
+  ManualTimers timers{clock};
+  ManualExecutor executor;
+  FixedRandom random;
+  FakeUserDefaults userDefaults;
+  FakeDeviceProperties deviceProperties;
+  FakeConsent consent;
+  OpenSSLCryptography cryptography;
+  PugixmlPropertyLists propertyLists;
+  RapidJSONWriter json;
+  ZlibDeflate deflate;
+  LinuxMemoryInfo memory;
+  FakeURLSessionFactory urlSessions;
+  FakeBundle clientBundle, daemonBundle;
+
+  Platform platform{
+      limits,       counters,         log,          clock,        timers,        executor, random,
+      userDefaults, deviceProperties, consent,      cryptography, propertyLists, json,     deflate,
+      memory,       urlSessions,      clientBundle, daemonBundle};
+
+  DeviceIdentity deviceIdentity{platform};
+  Environment environment{platform, deviceIdentity,
+                          StorebagHosts{"https://partners.example.org", "https://bags.example.org"}};
+  Configuration configuration{platform, deviceIdentity, environment};
+};
+
+}  // namespace kyt
