@@ -1,0 +1,230 @@
+#include "devserver/HttpServer.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "devserver/EventStream.h"
+#include "devserver/Text.h"
+
+namespace kyt::devserver {
+namespace {
+
+constexpr unsigned kThreads = 2;
+
+MHD_Result collect(void* into, MHD_ValueKind, const char* name, const char* value) {
+  static_cast<std::vector<Header>*>(into)->push_back({name, value != nullptr ? value : ""});
+  return MHD_YES;
+}
+
+ssize_t readStream(void* context, uint64_t, char* out, size_t size) {
+  auto& [queue, connection] =
+      *static_cast<std::pair<std::shared_ptr<StreamQueue>, MHD_Connection*>*>(context);
+  return queue->read(connection, out, size);
+}
+
+void freeStream(void* context) {
+  delete static_cast<std::pair<std::shared_ptr<StreamQueue>, MHD_Connection*>*>(context);
+}
+
+MHD_Result send(MHD_Connection* connection, const Reply& reply) {
+  if (reply.close) return MHD_NO;
+  MHD_Response* response = MHD_create_response_from_buffer(
+      reply.body.size(), const_cast<char*>(reply.body.data()), MHD_RESPMEM_MUST_COPY);
+  if (!reply.body.empty()) MHD_add_response_header(response, "Content-Type", reply.type.c_str());
+  MHD_add_response_header(response, "X-Content-Type-Options", "nosniff");
+  for (const Header& header : reply.headers) {
+    MHD_add_response_header(response, header.name.c_str(), header.value.c_str());
+  }
+  const MHD_Result result = MHD_queue_response(connection, reply.status, response);
+  MHD_destroy_response(response);
+  return result;
+}
+
+MHD_Result sendStream(MHD_Connection* connection, std::shared_ptr<StreamQueue> queue) {
+  constexpr size_t kBlock = 16384;
+  auto* context = new std::pair<std::shared_ptr<StreamQueue>, MHD_Connection*>(std::move(queue), connection);
+  MHD_Response* response =
+      MHD_create_response_from_callback(MHD_SIZE_UNKNOWN, kBlock, readStream, context, freeStream);
+  MHD_add_response_header(response, "Content-Type", "text/event-stream");
+  MHD_add_response_header(response, "Cache-Control", "no-store");
+  const MHD_Result result = MHD_queue_response(connection, 200, response);
+  MHD_destroy_response(response);
+  return result;
+}
+
+// A listening socket on the address, or -1 with the reason.
+int listenOn(const std::string& address, uint16_t port, std::string& error) {
+  sockaddr_in v4{};
+  sockaddr_in6 v6{};
+  v4.sin_family = AF_INET;
+  v4.sin_port = htons(port);
+  v6.sin6_family = AF_INET6;
+  v6.sin6_port = htons(port);
+  const bool isV4 = inet_pton(AF_INET, address.c_str(), &v4.sin_addr) == 1;
+  if (!isV4 && inet_pton(AF_INET6, address.c_str(), &v6.sin6_addr) != 1) {
+    error = "\"" + printable(address) + "\" is no address to listen on";
+    return -1;
+  }
+  const int descriptor = socket(isV4 ? AF_INET : AF_INET6, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  const int on = 1;
+  const auto* name = isV4 ? reinterpret_cast<const sockaddr*>(&v4) : reinterpret_cast<const sockaddr*>(&v6);
+  const socklen_t size = isV4 ? sizeof v4 : sizeof v6;
+  if (descriptor < 0 || setsockopt(descriptor, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on) != 0 ||
+      bind(descriptor, name, size) != 0 || listen(descriptor, SOMAXCONN) != 0) {
+    error = "can't listen on " + address + " port " + std::to_string(port) + ": " + std::strerror(errno);
+    if (descriptor >= 0) close(descriptor);
+    return -1;
+  }
+  return descriptor;
+}
+
+}  // namespace
+
+// One request from its headers to its answer. Belongs to the connection's thread.
+class HttpServer::Exchange {
+ public:
+  Exchange(HttpServer& server, MHD_Connection* connection, const char* path, const char* method)
+      : server_(server), connection_(connection) {
+    request_.method = method;
+    request_.path = path;
+    request_.secure = server.secure_;
+    MHD_get_connection_values(connection, MHD_HEADER_KIND, collect, &request_.headers);
+    MHD_get_connection_values(connection, MHD_GET_ARGUMENT_KIND, collect, &request_.arguments);
+    if (const std::string* length = request_.header("Content-Length")) {
+      if (const auto value = parseInteger(*length); value && *value >= 0) {
+        request_.contentLength = static_cast<uint64_t>(*value);
+      }
+    }
+    limit_ = server.handler_.bodyLimit(request_);
+    request_.tooLarge = request_.contentLength && *request_.contentLength > limit_;
+  }
+
+  // The headers are there. A client that asks before it sends too much is answered at once.
+  MHD_Result begin() {
+    if (request_.tooLarge && request_.header("Expect") != nullptr) return conclude();
+    return MHD_YES;
+  }
+
+  MHD_Result take(const char* bytes, size_t* size) {
+    request_.bodySize += *size;
+    if (request_.bodySize > limit_) request_.tooLarge = true;
+    if (request_.tooLarge) {
+      request_.body.clear();
+    } else {
+      request_.body.append(bytes, *size);
+    }
+    *size = 0;
+    if (std::chrono::steady_clock::now() - request_.began <= server_.bodyTime_) return MHD_YES;
+    request_.tooSlow = true;
+    server_.handler_.broken(request_);
+    answered_ = true;
+    return MHD_NO;
+  }
+
+  // The body is whole, or the wait is over.
+  MHD_Result conclude() {
+    if (!answered_) {
+      answered_ = true;
+      answer_ = server_.handler_.answer(request_);
+    }
+    if (auto* reply = std::get_if<Reply>(&answer_)) return send(connection_, *reply);
+    if (auto* stream = std::get_if<std::shared_ptr<StreamQueue>>(&answer_))
+      return sendStream(connection_, *stream);
+    return wait(std::get<Wait>(answer_));
+  }
+
+  void end(MHD_RequestTerminationCode code) {
+    if (answered_) return;
+    request_.tooSlow = code == MHD_REQUEST_TERMINATED_TIMEOUT_REACHED;
+    server_.handler_.broken(request_);
+  }
+
+ private:
+  MHD_Result wait(Wait& wait) {
+    for (;;) {
+      const uint64_t generation = server_.suspensions_.generation();
+      const bool expired =
+          std::chrono::steady_clock::now() >= wait.deadline || server_.suspensions_.stopped();
+      if (const std::optional<Reply> reply = wait.poll(expired)) return send(connection_, *reply);
+      if (expired) return MHD_NO;
+      if (server_.suspensions_.suspend(connection_, wait, generation)) return MHD_YES;
+    }
+  }
+
+  HttpServer& server_;
+  MHD_Connection* connection_;
+  Request request_;
+  Answer answer_;
+  uint64_t limit_ = 0;
+  bool answered_ = false;
+};
+
+MHD_Result HttpServer::onRequest(void* self, MHD_Connection* connection, const char* path, const char* method,
+                                 const char* /*version*/, const char* body, size_t* bodySize,
+                                 void** exchange) {
+  if (*exchange == nullptr) {
+    auto* made = new Exchange(*static_cast<HttpServer*>(self), connection, path, method);
+    *exchange = made;
+    return made->begin();
+  }
+  auto* known = static_cast<Exchange*>(*exchange);
+  return *bodySize > 0 ? known->take(body, bodySize) : known->conclude();
+}
+
+void HttpServer::onEnd(void* /*self*/, MHD_Connection* /*connection*/, void** exchange,
+                       MHD_RequestTerminationCode code) {
+  const std::unique_ptr<Exchange> ended(static_cast<Exchange*>(*exchange));
+  *exchange = nullptr;
+  if (ended) ended->end(code);
+}
+
+std::unique_ptr<HttpServer> HttpServer::start(const Options& options, uint16_t port, const Identity* identity,
+                                              HttpHandler& handler, Suspensions& suspensions,
+                                              std::string& error) {
+  const int listener = listenOn(options.listen, port, error);
+  if (listener < 0) return nullptr;
+  std::unique_ptr<HttpServer> server(new HttpServer(options, identity != nullptr, handler, suspensions));
+  unsigned flags = MHD_USE_EPOLL_INTERNAL_THREAD | MHD_ALLOW_SUSPEND_RESUME;
+  if (identity != nullptr) flags |= MHD_USE_TLS;
+  std::vector<MHD_OptionItem> tls;
+  if (identity != nullptr) {
+    tls.push_back({MHD_OPTION_HTTPS_MEM_KEY, 0, const_cast<char*>(identity->key.c_str())});
+    tls.push_back({MHD_OPTION_HTTPS_MEM_CERT, 0, const_cast<char*>(identity->certificate.c_str())});
+    tls.push_back(
+        {MHD_OPTION_HTTPS_PRIORITIES, 0, const_cast<char*>("NORMAL:-VERS-ALL:+VERS-TLS1.3:+VERS-TLS1.2")});
+  }
+  tls.push_back({MHD_OPTION_END, 0, nullptr});
+  server->daemon_ =
+      MHD_start_daemon(flags, port, nullptr, nullptr, &HttpServer::onRequest, server.get(), MHD_OPTION_ARRAY,
+                       tls.data(), MHD_OPTION_LISTEN_SOCKET, listener, MHD_OPTION_THREAD_POOL_SIZE, kThreads,
+                       MHD_OPTION_CONNECTION_LIMIT, options.maxConnections, MHD_OPTION_CONNECTION_TIMEOUT,
+                       static_cast<unsigned>(options.requestTimeout.count()), MHD_OPTION_NOTIFY_COMPLETED,
+                       &HttpServer::onEnd, server.get(), MHD_OPTION_END);
+  if (server->daemon_ == nullptr) {
+    error = "can't start the server on port " + std::to_string(port);
+    close(listener);
+    return nullptr;
+  }
+  return server;
+}
+
+HttpServer::~HttpServer() {
+  if (daemon_ != nullptr) MHD_stop_daemon(daemon_);
+}
+
+uint16_t HttpServer::port() const {
+  const MHD_DaemonInfo* info = MHD_get_daemon_info(daemon_, MHD_DAEMON_INFO_LISTEN_FD);
+  sockaddr_storage address{};
+  socklen_t size = sizeof address;
+  if (info == nullptr || getsockname(info->listen_fd, reinterpret_cast<sockaddr*>(&address), &size) != 0)
+    return 0;
+  return ntohs(address.ss_family == AF_INET ? reinterpret_cast<sockaddr_in*>(&address)->sin_port
+                                            : reinterpret_cast<sockaddr_in6*>(&address)->sin6_port);
+}
+
+}  // namespace kyt::devserver

@@ -1,0 +1,46 @@
+// Judges one event post: length, gzip, JSON shape, digest. Fills the verdict and the events in; what is wrong
+// is said in one sentence that names the place. Constant after construction, any thread.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "devserver/Options.h"
+#include "devserver/Post.h"
+
+namespace kyt::devserver {
+
+class PostChecker {
+ public:
+  PostChecker(std::vector<DigestKey> keys, uint64_t maxInflatedBytes)
+      : keys_(std::move(keys)), maxInflatedBytes_(maxInflatedBytes) {}
+
+  // Precondition: headers, body, method and path are set and the body is whole.
+  void check(Post& post) const;
+
+  // Fills client, service and sender in from the headers.
+  static void readNames(Post& post);
+
+  // The JSON text of a body as sent, or why there is none.
+  [[nodiscard]] std::optional<std::string> textOf(const std::vector<Header>& headers, std::string_view body,
+                                                  std::string& reason) const;
+
+ private:
+  [[nodiscard]] bool checkDigest(Post& post) const;
+
+  const std::vector<DigestKey> keys_;
+  const uint64_t maxInflatedBytes_;
+};
+
+// The value of a header, whatever the case of its name, or null.
+[[nodiscard]] const std::string* findHeader(const std::vector<Header>& headers, std::string_view name);
+
+// The same JSON, compact or indented, or nothing when it is malformed or nested too deeply.
+[[nodiscard]] std::optional<std::string> rewriteJson(std::string_view text, bool pretty);
+
+// HMAC-SHA1 as posts carry it: "<0a1b2c3d 4e5f6071 8293a4b5 c6d7e8f9 0a1b2c3d>".
+[[nodiscard]] std::string digestText(std::string_view key, std::string_view body);
+
+}  // namespace kyt::devserver

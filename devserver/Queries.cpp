@@ -1,0 +1,349 @@
+#include "devserver/Queries.h"
+
+#include <algorithm>
+#include <array>
+
+#include "devserver/JsonText.h"
+
+namespace kyt::devserver {
+namespace {
+
+constexpr int64_t kDefaultLimit = 100;
+constexpr int64_t kMaxLimit = 10000;
+constexpr size_t kEventsToldAtOnce = 100;
+constexpr int64_t kDefaultMinutes = 30;
+constexpr int64_t kMaxMinutes = 24 * 60;
+constexpr std::array kTextFilters = {"client", "service", "sender", "session"};
+constexpr std::array kNumberFilters = {"method", "status", "post"};
+
+constexpr char kPostColumns[] =
+    "id, received, secure, http_method, path, client, service, sender, good, reason, digest, answered, "
+    "client_id, "
+    "post_time, size, text_size, events";
+
+Reply json(std::string text) {
+  return {200, std::move(text), "application/json", {}};
+}
+Reply wrong(const std::string& what) {
+  return {400, what + "\n", "text/plain; charset=utf-8", {}};
+}
+Reply missing(const std::string& what) {
+  return {404, what + "\n", "text/plain; charset=utf-8", {}};
+}
+
+// An argument that is a number of at least 0; absent it is `otherwise`, wrong it is -1.
+int64_t numberArgument(const Request& request, std::string_view name, int64_t otherwise) {
+  const auto text = request.argument(name);
+  if (!text) return otherwise;
+  const auto value = parseInteger(*text);
+  return value && *value >= 0 ? *value : -1;
+}
+
+int64_t limitOf(const Request& request) {
+  return std::min(numberArgument(request, "limit", kDefaultLimit), kMaxLimit);
+}
+
+// "WHERE …" for the filters that the request names, to be bound with bindFilters.
+std::string filterClause(const Request& request) {
+  std::string clause;
+  const auto add = [&](const char* name) {
+    if (request.argument(name)) clause += (clause.empty() ? " WHERE " : " AND ") + std::string(name) + " = ?";
+  };
+  std::for_each(kTextFilters.begin(), kTextFilters.end(), add);
+  std::for_each(kNumberFilters.begin(), kNumberFilters.end(), add);
+  return clause;
+}
+
+void bindFilters(const Request& request, Statement& statement) {
+  for (const char* name : kTextFilters) {
+    if (const auto text = request.argument(name)) statement.bind(*text);
+  }
+  for (const char* name : kNumberFilters) {
+    if (request.argument(name)) statement.bind(numberArgument(request, name, 0));
+  }
+}
+
+int64_t countEventsIn(Database& database, const Request& request) {
+  Statement statement = database.prepare("SELECT count(*) FROM events" + filterClause(request));
+  bindFilters(request, statement);
+  return statement.step() ? statement.integer(0) : 0;
+}
+
+void optionalNumber(JsonText& out, const char* name, const Statement& row, int column) {
+  out.member(name, row.isNull(column) ? std::nullopt : std::optional(row.integer(column)));
+}
+
+void optionalReal(JsonText& out, const char* name, const Statement& row, int column) {
+  out.member(name, row.isNull(column) ? std::nullopt : std::optional(row.real(column)));
+}
+
+void postMembers(JsonText& out, const Statement& row) {
+  out.member("id", row.integer(0)).member("received", row.real(1)).member("secure", row.integer(2) != 0);
+  out.member("method", row.text(3)).member("path", row.text(4)).member("client", row.text(5));
+  out.member("service", row.text(6)).member("sender", row.text(7)).member("good", row.integer(8) != 0);
+  out.member("reason", row.text(9)).member("digest", row.text(10)).member("answered", row.integer(11));
+  out.member("clientId", row.text(12));
+  optionalReal(out, "postTime", row, 13);
+  out.member("size", row.integer(14)).member("textSize", row.integer(15)).member("events", row.integer(16));
+}
+
+void postMembers(JsonText& out, const Post& post) {
+  out.member("id", post.id).member("received", post.received).member("secure", post.secure);
+  out.member("method", post.method).member("path", post.path).member("client", post.client);
+  out.member("service", post.service).member("sender", post.sender).member("good", post.good);
+  out.member("reason", post.reason).member("digest", post.digest).member("answered", post.answered);
+  out.member("clientId", post.clientId).member("postTime", post.postTime).member("size", post.body.size());
+  out.member("textSize", post.textSize).member("events", post.events.size());
+}
+
+void eventObject(JsonText& out, const Event& event, const Post& post) {
+  out.object().member("post", post.id).member("received", post.received).member("client", event.client);
+  out.member("service", event.service).member("sender", event.sender).member("method", event.method);
+  out.member("status", event.status).member("session", event.session).member("number", event.number);
+  out.member("time", event.time).key("record").json(event.record).endObject();
+}
+
+void eventObject(JsonText& out, const Statement& row) {
+  out.object().member("id", row.integer(0)).member("post", row.integer(1)).member("received", row.real(2));
+  out.member("client", row.text(3)).member("service", row.text(4)).member("sender", row.text(5));
+  optionalNumber(out, "method", row, 6);
+  optionalNumber(out, "status", row, 7);
+  out.member("session", row.text(8));
+  optionalNumber(out, "number", row, 9);
+  optionalReal(out, "time", row, 10);
+  out.key("record").json(row.text(11)).endObject();
+}
+
+void fetchObject(JsonText& out, const Fetch& fetch) {
+  out.object().member("id", fetch.id).member("time", fetch.time).member("secure", fetch.secure);
+  out.member("name", fetch.name).member("path", fetch.path).member("version", fetch.version);
+  out.member("status", fetch.status).member("ifModifiedSince", fetch.ifModifiedSince);
+  out.member("lastModified", fetch.lastModified).member("userAgent", fetch.userAgent).endObject();
+}
+
+std::vector<Header> headersFromRow(std::string_view json) {
+  // The store writes [["Name","value"],…]; only the encoding is looked for here.
+  for (const char* encoding : {"gzip", "identity"}) {
+    const std::string entry = std::string("[\"Content-Encoding\",\"") + encoding + "\"]";
+    if (std::search(json.begin(), json.end(), entry.begin(), entry.end(), [](char a, char b) {
+          return std::tolower(static_cast<unsigned char>(a)) == std::tolower(static_cast<unsigned char>(b));
+        }) != json.end()) {
+      return {{"Content-Encoding", encoding}};
+    }
+  }
+  return {};
+}
+
+void groupRows(JsonText& out, const char* name, Statement statement,
+               const std::vector<const char*>& columns) {
+  out.key(name).array();
+  while (statement.step()) {
+    out.object();
+    for (size_t i = 0; i < columns.size(); ++i) {
+      const std::string_view column = columns[i];
+      const int index = static_cast<int>(i);
+      if (column == "client" || column == "service" || column == "sender" || column == "session") {
+        out.member(column, statement.text(index));
+      } else if (column == "first" || column == "last") {
+        out.member(column, statement.real(index));
+      } else {
+        optionalNumber(out, columns[i], statement, index);
+      }
+    }
+    out.endObject();
+  }
+  out.endArray();
+}
+
+}  // namespace
+
+Reply Queries::answer(const Request& request) {
+  if (limitOf(request) < 0) return wrong("limit is no number");
+  if (numberArgument(request, "since", 0) < 0) return wrong("since is no number");
+  for (const char* name : kNumberFilters) {
+    if (numberArgument(request, name, 0) < 0) return wrong(std::string(name) + " is no number");
+  }
+  const std::string_view path = std::string_view(request.path).substr(4);  // past "/api"
+  if (path == "/posts") return posts(request);
+  if (path == "/events") return events(request);
+  if (path == "/sessions") return sessions(request);
+  if (path == "/counts") return counts(request);
+  if (path == "/storebags") return storebags(request);
+  if (path == "/totals") return json(totalsAsJson(store_.totals()));
+  if (path.starts_with("/posts/")) {
+    std::string_view rest = path.substr(7);
+    const bool raw = rest.ends_with("/body");
+    if (raw) rest.remove_suffix(5);
+    if (const auto id = parseInteger(rest)) return raw ? body(*id) : post(*id);
+  }
+  return missing("no such query");
+}
+
+int64_t Queries::countEvents(const Request& request) {
+  return store_.read([&](Database& database) { return countEventsIn(database, request); });
+}
+
+bool Queries::hasFilters(const Request& request) {
+  return !filterClause(request).empty();
+}
+
+std::string Queries::totalsAsJson(const Totals& totals) {
+  JsonText out;
+  out.object().member("posts", totals.posts).member("bad", totals.bad).member("events", totals.events);
+  return out.member("fetches", totals.fetches).endObject().text();
+}
+
+std::string Queries::commitAsJson(const Commit& commit) {
+  JsonText out;
+  out.object().key("totals").json(totalsAsJson(commit.totals)).key("posts").array();
+  size_t skipped = 0;
+  for (const Post& post : commit.posts) {
+    postMembers(out.object(), post);
+    out.endObject();
+    skipped += post.events.size();
+  }
+  skipped -= std::min(skipped, kEventsToldAtOnce);
+  out.endArray().member("eventsLeftOut", skipped).key("events").array();
+  for (const Post& post : commit.posts) {
+    for (const Event& event : post.events) {
+      if (skipped > 0) {
+        --skipped;
+      } else {
+        eventObject(out, event, post);
+      }
+    }
+  }
+  out.endArray().key("fetches").array();
+  for (const Fetch& fetch : commit.fetches) fetchObject(out, fetch);
+  return out.endArray().endObject().text();
+}
+
+Reply Queries::posts(const Request& request) {
+  const bool onward = request.argument("since").has_value();
+  return store_.read([&](Database& database) {
+    const std::string where = request.argument("bad") ? " AND NOT good" : "";
+    Statement row = database.prepare("SELECT " + std::string(kPostColumns) + " FROM posts WHERE id > ?" +
+                                     where + " ORDER BY id " + (onward ? "ASC" : "DESC") + " LIMIT ?");
+    row.bind(numberArgument(request, "since", 0)).bind(limitOf(request));
+    JsonText out;
+    out.object().key("posts").array();
+    while (row.step()) {
+      postMembers(out.object(), row);
+      out.endObject();
+    }
+    return json(out.endArray().endObject().text());
+  });
+}
+
+Reply Queries::post(int64_t id) {
+  return store_.read([&](Database& database) {
+    Statement row =
+        database.prepare("SELECT " + std::string(kPostColumns) + ", headers, body FROM posts WHERE id = ?");
+    row.bind(id);
+    if (!row.step()) return missing("no such post");
+    JsonText out;
+    postMembers(out.object(), row);
+    out.key("headers").json(row.text(17));
+    std::string reason;
+    const std::string_view sent = row.text(18);
+    const std::optional<std::string> text = checker_.textOf(headersFromRow(row.text(17)), sent, reason);
+    const std::string_view shown = text ? std::string_view(*text) : sent;
+    out.member("bodyIsText", isValidUTF8(shown)).member("body", shown);
+    const std::optional<std::string> compact = rewriteJson(shown, false);
+    out.key("json").json(compact ? *compact : "null");
+    out.member("pretty", rewriteJson(shown, true));
+    return json(out.endObject().text());
+  });
+}
+
+Reply Queries::body(int64_t id) {
+  return store_.read([&](Database& database) {
+    Statement row = database.prepare("SELECT body FROM posts WHERE id = ?");
+    row.bind(id);
+    if (!row.step()) return missing("no such post");
+    Reply reply{200, std::string(row.text(0)), "application/octet-stream", {}};
+    reply.headers.push_back(
+        {"Content-Disposition", "attachment; filename=\"post-" + std::to_string(id) + "\""});
+    return reply;
+  });
+}
+
+Reply Queries::events(const Request& request) {
+  const bool onward = request.argument("since").has_value();
+  return store_.read([&](Database& database) {
+    const std::string where = filterClause(request);
+    Statement row = database.prepare(
+        "SELECT id, post, received, client, service, sender, method, status, session, number, time, record "
+        "FROM events" +
+        where + (where.empty() ? " WHERE" : " AND") + " id > ? ORDER BY id " + (onward ? "ASC" : "DESC") +
+        " LIMIT ?");
+    bindFilters(request, row);
+    row.bind(numberArgument(request, "since", 0)).bind(limitOf(request));
+    JsonText out;
+    out.object().member("total", countEventsIn(database, request)).key("events").array();
+    while (row.step()) eventObject(out, row);
+    return json(out.endArray().endObject().text());
+  });
+}
+
+Reply Queries::sessions(const Request& request) {
+  return store_.read([&](Database& database) {
+    Statement rows = database.prepare(
+        "SELECT session, client, service, sender, count(*), min(received), max(received), max(number) FROM "
+        "events "
+        "GROUP BY session, client, service, sender ORDER BY max(received) DESC LIMIT ?");
+    rows.bind(limitOf(request));
+    JsonText out;
+    out.object();
+    groupRows(out, "sessions", std::move(rows),
+              {"session", "client", "service", "sender", "events", "first", "last", "highestNumber"});
+    return json(out.endObject().text());
+  });
+}
+
+Reply Queries::counts(const Request& request) {
+  const int64_t minutes = std::min(numberArgument(request, "minutes", kDefaultMinutes), kMaxMinutes);
+  if (minutes < 0) return wrong("minutes is no number");
+  const Totals totals = store_.totals();
+  return store_.read([&](Database& database) {
+    JsonText out;
+    const auto now = static_cast<int64_t>(timeNow());
+    out.object().key("totals").json(totalsAsJson(totals)).member("now", now).member("minutes", minutes);
+    groupRows(out, "byClient",
+              database.prepare(
+                  "SELECT client, service, sender, count(*) FROM events GROUP BY client, service, sender "
+                  "ORDER BY count(*) DESC LIMIT 1000"),
+              {"client", "service", "sender", "events"});
+    groupRows(out, "byMethod",
+              database.prepare("SELECT method, status, count(*) FROM events GROUP BY method, status "
+                               "ORDER BY count(*) DESC LIMIT 1000"),
+              {"method", "status", "events"});
+    Statement perMinute = database.prepare(
+        "SELECT CAST(received / 60 AS INTEGER) * 60 AS minute, client, method, count(*) FROM events "
+        "WHERE received >= ? GROUP BY minute, client, method ORDER BY minute");
+    perMinute.bind((now / 60 - minutes + 1) * 60);
+    groupRows(out, "perMinute", std::move(perMinute), {"minute", "client", "method", "events"});
+    return json(out.endObject().text());
+  });
+}
+
+Reply Queries::storebags(const Request& request) {
+  const bool onward = request.argument("since").has_value();
+  return store_.read([&](Database& database) {
+    Statement row = database.prepare(
+        std::string("SELECT id, time, secure, name, path, version, status, if_modified_since, last_modified, "
+                    "user_agent FROM fetches WHERE id > ? ORDER BY id ") +
+        (onward ? "ASC" : "DESC") + " LIMIT ?");
+    row.bind(numberArgument(request, "since", 0)).bind(limitOf(request));
+    JsonText out;
+    out.object().key("fetches").array();
+    while (row.step()) {
+      const auto text = [&](int column) { return std::string(row.text(column)); };
+      fetchObject(out, {row.integer(0), row.real(1), row.integer(2) != 0, text(3), text(4), text(5),
+                        static_cast<unsigned>(row.integer(6)), text(7), text(8), text(9)});
+    }
+    return json(out.endArray().endObject().text());
+  });
+}
+
+}  // namespace kyt::devserver

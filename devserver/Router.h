@@ -1,0 +1,51 @@
+// The endpoints: storebags and event posts for devices, and on the plain port the page, the queries and the
+// controls for tests. Owns nothing that outlives it; called on the HTTP servers' threads, several at a time.
+#pragma once
+
+#include <string>
+
+#include "devserver/EventStream.h"
+#include "devserver/Http.h"
+#include "devserver/Options.h"
+#include "devserver/PostChecker.h"
+#include "devserver/Queries.h"
+#include "devserver/ReplyRules.h"
+#include "devserver/Store.h"
+#include "devserver/Storebags.h"
+#include "devserver/Suspensions.h"
+
+namespace kyt::devserver {
+
+class Router final : public HttpHandler {
+ public:
+  Router(const Options& options, Store& store, const PostChecker& checker, EventStream& stream,
+         Suspensions& suspensions);
+
+  [[nodiscard]] uint64_t bodyLimit(const Request& request) const override;
+  [[nodiscard]] Answer answer(Request& request) override;
+  void broken(Request& request) override;
+
+ private:
+  [[nodiscard]] bool takesPosts(const Request& request) const;
+  [[nodiscard]] bool comesFromThisPlace(const Request& request) const;
+  [[nodiscard]] Answer answerEvents(Request& request);
+  [[nodiscard]] Answer answerStorebag(const Request& request);
+  [[nodiscard]] Answer answerControl(const Request& request);
+  [[nodiscard]] Answer answerWait(const Request& request);
+  [[nodiscard]] Answer answerStream();
+  [[nodiscard]] Reply page() const;
+  // The reply as a rule changes it.
+  [[nodiscard]] Answer applyRule(const std::optional<ReplyRule>& rule, Reply reply);
+
+  const Options& options_;
+  Store& store_;
+  const PostChecker& checker_;
+  EventStream& stream_;
+  Suspensions& suspensions_;
+  Queries queries_;
+  ReplyRules rules_;
+  Storebags storebags_;
+  const std::string pagePolicy_;
+};
+
+}  // namespace kyt::devserver

@@ -1,0 +1,68 @@
+#include "devserver/Storebags.h"
+
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <cstdio>
+
+#define TOML_EXCEPTIONS 0
+#include <toml++/toml.h>
+
+#include "devserver/Files.h"
+#include "devserver/Text.h"
+
+namespace kyt::devserver {
+namespace {
+
+constexpr size_t kMaxStorebag = 16 << 20;
+constexpr size_t kMaxOverrides = 64 * 1024;
+
+bool isName(std::string_view name) {
+  return !name.empty() && name.size() <= 64 && std::all_of(name.begin(), name.end(), [](unsigned char c) {
+    return std::isalnum(c) != 0 || c == '-' || c == '_';
+  });
+}
+
+}  // namespace
+
+std::optional<Storebag> Storebags::find(const std::string& name) {
+  if (folder_.empty() || !isName(name)) return std::nullopt;
+  const std::filesystem::path path = folder_ / (name + ".plist");
+  MutexLock lock(mutex_);
+  struct stat status {};
+  if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
+  Entry& entry = entries_[name];
+  const std::tuple<int64_t, int64_t, uint64_t, int64_t> version{status.st_mtim.tv_sec, status.st_mtim.tv_nsec,
+                                                                status.st_ino, status.st_size};
+  if (!entry.content || entry.version != version) {
+    std::optional<std::string> content = readFile(path, kMaxStorebag);
+    if (!content) return std::nullopt;
+    const bool sameSecond =
+        entry.content && *entry.content != *content && status.st_mtim.tv_sec <= entry.lastModified;
+    entry.lastModified = sameSecond ? entry.lastModified + 1 : status.st_mtim.tv_sec;
+    entry.version = version;
+    entry.content = std::make_shared<const std::string>(std::move(*content));
+  }
+  Storebag bag{entry.content, httpDate(entry.lastModified), "max-age=" + std::to_string(maxAge_)};
+  applyOverrides(name, bag);
+  return bag;
+}
+
+void Storebags::applyOverrides(const std::string& name, Storebag& bag) const {
+  const std::filesystem::path path = folder_ / (name + ".toml");
+  const std::optional<std::string> text = readFile(path, kMaxOverrides);
+  if (!text) return;
+  const toml::parse_result result = toml::parse(std::string_view(*text));
+  if (!result) {
+    std::fprintf(stderr, "kytdevserver: %s is no TOML and has no effect: %s\n", path.c_str(),
+                 printable(result.error().description()).c_str());
+    return;
+  }
+  const toml::table& table = result.table();
+  if (const auto maxAge = table["max_age"].value<int64_t>())
+    bag.cacheControl = "max-age=" + std::to_string(*maxAge);
+  if (const auto whole = table["cache_control"].value<std::string>()) bag.cacheControl = printable(*whole);
+  if (!table["last_modified"].value_or(true)) bag.lastModified.clear();
+}
+
+}  // namespace kyt::devserver

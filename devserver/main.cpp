@@ -1,0 +1,173 @@
+// kytdevserver: the back end for development and tests. Reads the command line, builds the objects in their
+// order, says on standard output and in the ready file where it listens, and runs until SIGINT or SIGTERM.
+#include <fcntl.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <system_error>
+
+#include "devserver/Certificates.h"
+#include "devserver/Files.h"
+#include "devserver/HttpServer.h"
+#include "devserver/JsonText.h"
+#include "devserver/Options.h"
+#include "devserver/Router.h"
+
+namespace kyt::devserver {
+namespace {
+
+int fail(const std::string& what) {
+  std::fprintf(stderr, "kytdevserver: %s\n", what.c_str());
+  return 1;
+}
+
+// "[CLIENT=]HEX"
+std::optional<DigestKey> digestKeyFrom(const std::string& text) {
+  const size_t sign = text.rfind('=');
+  const std::string client = sign == std::string::npos ? std::string() : text.substr(0, sign);
+  const auto key = bytesFromHex(sign == std::string::npos ? text : text.substr(sign + 1));
+  if (!key || key->empty()) return std::nullopt;
+  return DigestKey{client, *key};
+}
+
+bool isHost(const std::string& host) {
+  return !host.empty() && std::all_of(host.begin(), host.end(), [](unsigned char c) {
+    return std::isalnum(c) != 0 || c == '.' || c == '-' || c == ':';
+  });
+}
+
+void describe(CLI::App& app, Options& options, std::vector<std::string>& digestKeys) {
+  app.add_option("--state", options.state, "Folder of certificates and database; made when missing")
+      ->required();
+  app.add_option("--bags", options.bags, "Folder of signed storebags, NAME.plist");
+  app.add_option("--https-port", options.httpsPort, "Port for devices; 0: any free one")
+      ->capture_default_str();
+  app.add_option("--http-port", options.httpPort, "Port of the page and the queries; 0: any free one")
+      ->capture_default_str();
+  app.add_option("--listen", options.listen, "Address to listen on")->capture_default_str();
+  app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)");
+  app.add_option("--ready-file", options.readyFile, "Written when the ports are open: their numbers as JSON");
+  app.add_flag("--http-events", options.httpEvents, "Take event posts on the plain port too");
+  app.add_option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control")->capture_default_str();
+  app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)");
+  app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post as sent")->capture_default_str();
+  app.add_option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON")->capture_default_str();
+  app.add_option("--request-timeout", options.requestTimeout, "Seconds for a request to be whole")
+      ->check(CLI::Range(1, 3600))
+      ->default_str("60");
+  app.add_option("--keep-posts", options.keepPosts, "Posts kept; the oldest go")->capture_default_str();
+  app.add_option("--keep-bytes", options.keepBytes, "Bytes of posts kept; the oldest go")
+      ->capture_default_str();
+  app.add_option("--max-connections", options.maxConnections, "Connections of each port")
+      ->check(CLI::Range(4, 60000))
+      ->capture_default_str();
+}
+
+// The folder's lock, held until the process ends, or -1 with the reason.
+int lockState(const std::filesystem::path& state, std::string& error) {
+  std::error_code code;
+  std::filesystem::create_directories(state, code);
+  const int lock = open((state / "lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+  if (lock < 0) {
+    error = "can't use the folder " + state.string() + ": " + std::strerror(errno);
+  } else if (flock(lock, LOCK_EX | LOCK_NB) != 0) {
+    error = "another server uses the folder " + state.string();
+    close(lock);
+    return -1;
+  }
+  return lock;
+}
+
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+  limit.rlim_cur = limit.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+std::string readyText(const Options& options, const HttpServer& https, const HttpServer& http) {
+  JsonText out;
+  out.object().member("https", https.port()).member("http", http.port()).member("listen", options.listen);
+  out.member("ca", std::filesystem::absolute(options.state / "ca.pem").string())
+      .member("pid", int64_t{getpid()});
+  return out.endObject().text() + "\n";
+}
+
+int serve(const Options& options, const sigset_t& signals) {
+  std::string error;
+  if (lockState(options.state, error) < 0) return fail(error);
+  std::vector<std::string> hosts = {"localhost", "127.0.0.1", "::1"};
+  hosts.insert(hosts.end(), options.hosts.begin(), options.hosts.end());
+  const auto identity = serverIdentity(options.state, hosts);
+  if (const auto* wrong = std::get_if<std::string>(&identity)) return fail(*wrong);
+
+  EventStream stream;
+  Suspensions suspensions([&] { stream.heartbeat(); });
+  const auto committed = [&](const Commit& commit) {
+    if (stream.hasListeners()) stream.publish("commit", Queries::commitAsJson(commit));
+    suspensions.wake(WaitFor::data);
+  };
+  const std::unique_ptr<Store> store = Store::open(options.state / "devserver.sqlite",
+                                                   {options.keepPosts, options.keepBytes}, committed, error);
+  if (!store) return fail(error);
+  const PostChecker checker(options.digestKeys, options.maxInflatedBytes);
+  Router router(options, *store, checker, stream, suspensions);
+  const auto https = HttpServer::start(options, options.httpsPort, &std::get<Identity>(identity), router,
+                                       suspensions, error);
+  const auto http =
+      https ? HttpServer::start(options, options.httpPort, nullptr, router, suspensions, error) : nullptr;
+
+  int status = 0;
+  if (http) {
+    const std::string ready = readyText(options, *https, *http);
+    if (!options.readyFile.empty() && !replaceFile(options.readyFile, ready, 0644)) {
+      status = fail("can't write " + options.readyFile.string() + ": " + std::strerror(errno));
+    } else {
+      std::fputs(ready.c_str(), stdout);
+      std::fflush(stdout);
+      int signal = 0;
+      sigwait(&signals, &signal);
+    }
+  } else {
+    status = fail(error);
+  }
+  // Whoever waits is answered or let go before the servers end.
+  suspensions.stop();
+  stream.close();
+  return status;
+}
+
+}  // namespace
+}  // namespace kyt::devserver
+
+int main(int argc, char** argv) {
+  using namespace kyt::devserver;
+  Options options;
+  std::vector<std::string> digestKeys;
+  CLI::App app("A back end for development and tests: storebags, event posts, and a page that shows them");
+  describe(app, options, digestKeys);
+  CLI11_PARSE(app, argc, argv);
+  for (const std::string& text : digestKeys) {
+    const auto key = digestKeyFrom(text);
+    if (!key) return fail("--digest-key takes [CLIENT=]HEX");
+    options.digestKeys.push_back(*key);
+  }
+  if (!std::all_of(options.hosts.begin(), options.hosts.end(), isHost)) {
+    return fail("--host takes a name or an address");
+  }
+  sigset_t signals;
+  sigemptyset(&signals);
+  sigaddset(&signals, SIGINT);
+  sigaddset(&signals, SIGTERM);
+  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+  signal(SIGPIPE, SIG_IGN);
+  raiseDescriptorLimit();
+  return serve(options, signals);
+}
