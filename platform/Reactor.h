@@ -25,8 +25,8 @@ namespace ready {
 inline constexpr unsigned readable = 1;
 inline constexpr unsigned writable = 2;
 inline constexpr unsigned ended =
-    4;  // the peer will send no more, or is gone; reported even when not asked for
-inline constexpr unsigned failed = 8;     // an error waits in the socket; reported even when not asked for
+    4;  // the peer sends no more (reported with `readable`), or is gone (always reported)
+inline constexpr unsigned failed = 8;     // an error waits in the socket (always reported)
 inline constexpr unsigned priority = 16;  // out-of-band data, or what the descriptor's kind uses it for
 // How to report; these never come to a handler.
 inline constexpr unsigned edgeTriggered = 32;

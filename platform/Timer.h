@@ -1,6 +1,6 @@
 // Delayed work and periodic timers.
 //
-// TimerService schedules work onto a serial queue. The real one is the reactor (platform/linux/EpollReactor.h); tests
+// TimerService schedules work onto a serial queue. The real one is the reactor (platform/linux/base/EpollReactor.h); tests
 // move platform/fake/ManualTimers.h together with the manual clock. Callable from any thread; never blocks; never fails.
 #pragma once
 

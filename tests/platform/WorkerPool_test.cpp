@@ -13,12 +13,13 @@
 #include "platform/Counters.h"
 #include "platform/Semaphore.h"
 #include "platform/SerialQueue.h"
+#include "tests/support/Eventually.h"
 
 namespace kyt {
 namespace {
 
 using namespace std::chrono_literals;
-constexpr Duration kDeadline = 30s;
+constexpr Duration kDeadline = kTestDeadline;
 
 WorkerPoolOptions options(size_t runnable, size_t most = 512, Duration idleExit = 10s) {
   WorkerPoolOptions result;
@@ -26,16 +27,6 @@ WorkerPoolOptions options(size_t runnable, size_t most = 512, Duration idleExit 
   result.maxWorkers = most;
   result.idleExit = idleExit;
   return result;
-}
-
-template <typename Condition>
-[[nodiscard]] bool eventually(Condition condition) {
-  const auto end = std::chrono::steady_clock::now() + kDeadline;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(200us);
-  }
-  return true;
 }
 
 TEST(WorkerPool, RunsWorkOnAThreadOfItsOwn) {

@@ -1,0 +1,397 @@
+// One mutex guards registrations and timers; it is never held while a handler runs or a queue is given work.
+// An event carries the number of its slot and the slot's generation, so that one harvested before its watch
+// was destroyed finds nothing.
+#include "platform/linux/base/EpollReactor.h"
+
+#include <errno.h>
+#include <sys/epoll.h>
+#include <sys/timerfd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <map>
+#include <set>
+#include <system_error>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "platform/ConditionVariable.h"
+#include "platform/Mutex.h"
+#include "platform/SerialQueue.h"
+#include "platform/linux/base/Descriptors.h"
+#include "platform/linux/base/Threads.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr uint64_t kStopEvent = ~uint64_t{0};
+constexpr uint64_t kTimerEvent = kStopEvent - 1;
+constexpr Duration kLongest = std::chrono::hours(24 * 365 * 20);  // keeps sums of times in range
+
+uint32_t epollEvents(unsigned events) {
+  uint32_t result = 0;
+  if ((events & ready::readable) != 0) result |= EPOLLIN | EPOLLRDHUP;
+  if ((events & ready::writable) != 0) result |= EPOLLOUT;
+  if ((events & ready::priority) != 0) result |= EPOLLPRI;
+  if ((events & ready::edgeTriggered) != 0) result |= EPOLLET;
+  if ((events & ready::oneShot) != 0) result |= EPOLLONESHOT;
+  return result;
+}
+
+unsigned readyBits(uint32_t events) {
+  unsigned result = 0;
+  if ((events & EPOLLIN) != 0) result |= ready::readable;
+  if ((events & EPOLLOUT) != 0) result |= ready::writable;
+  if ((events & EPOLLPRI) != 0) result |= ready::priority;
+  if ((events & (EPOLLRDHUP | EPOLLHUP)) != 0) result |= ready::ended;
+  if ((events & EPOLLERR) != 0) result |= ready::failed;
+  return result;
+}
+
+}  // namespace
+
+class EpollReactor::Registration final : public Watch::State {
+ public:
+  Registration(std::shared_ptr<Implementation> reactor, int descriptor, unsigned events, Handler handler)
+      : reactor_(std::move(reactor)),
+        descriptor_(descriptor),
+        events_(events),
+        handler_(std::move(handler)) {}
+  bool modify(unsigned events) override;
+  bool rearm() override;
+  void cancel() override;
+
+ private:
+  friend class Implementation;
+  const std::shared_ptr<Implementation> reactor_;
+  const int descriptor_;
+  // Guarded by the reactor's mutex.
+  unsigned events_;
+  uint32_t slot_ = 0;
+  bool registered_ = false;
+  // The reactor's thread's.
+  Handler handler_;
+};
+
+class EpollReactor::Timer final : public TimerHandle::State, public std::enable_shared_from_this<Timer> {
+ public:
+  Timer(std::shared_ptr<Implementation> reactor, Duration period, Duration leeway,
+        std::shared_ptr<SerialQueue> queue, Task work)
+      : reactor_(std::move(reactor)),
+        period_(period),
+        leeway_(leeway),
+        queue_(std::move(queue)),
+        work_(std::make_shared<Task>(std::move(work))) {}
+  void cancel() override;
+
+ private:
+  friend class Implementation;
+  const std::shared_ptr<Implementation> reactor_;
+  const Duration period_;  // zero: once
+  const Duration leeway_;
+  // Guarded by the reactor's mutex. What runs once is given away when it is due, so that a handle that lives
+  // on keeps nothing alive.
+  std::shared_ptr<SerialQueue> queue_;
+  std::shared_ptr<Task> work_;
+  MonotonicTime due_;
+  uint64_t id_ = 0;
+  bool armed_ = false;
+};
+
+class EpollReactor::Implementation : public std::enable_shared_from_this<Implementation> {
+ public:
+  [[nodiscard]] bool start(const char* threadName);
+  void stop();
+  Watch watch(int descriptor, unsigned events, Handler handler);
+  [[nodiscard]] bool modify(Registration& registration, unsigned events);
+  [[nodiscard]] bool rearm(Registration& registration);
+  void cancel(Registration& registration);
+  TimerHandle arm(Duration delay, Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue,
+                  Task work);
+  void cancel(Timer& timer);
+  [[nodiscard]] uint64_t wakeUps() const { return wakeUps_.load(std::memory_order_relaxed); }
+
+ private:
+  struct Slot {
+    std::shared_ptr<Registration> registration;
+    uint32_t generation = 0;
+  };
+  using TimerKey = std::pair<MonotonicTime, uint64_t>;
+
+  void run();
+  void dispatch(uint64_t tag, uint32_t events);
+  void fireTimers();
+  [[nodiscard]] bool control(int operation, const Registration& registration) REQUIRES(mutex_);
+  void insert(std::shared_ptr<Timer> timer) REQUIRES(mutex_);
+  [[nodiscard]] std::shared_ptr<Timer> remove(Timer& timer) REQUIRES(mutex_);
+  void setAlarm() REQUIRES(mutex_);
+
+  Descriptor epoll_, alarm_, stopEvent_;  // constant after start()
+  std::thread thread_;
+  std::atomic<std::thread::id> threadId_;
+  std::atomic<uint64_t> wakeUps_{0};
+  std::atomic<bool> stopping_{false};
+
+  Mutex mutex_;
+  ConditionVariable handlerDone_;
+  std::vector<Slot> slots_ GUARDED_BY(mutex_);
+  std::vector<uint32_t> freeSlots_ GUARDED_BY(mutex_);
+  const Registration* running_ GUARDED_BY(mutex_) = nullptr;  // whose handler runs
+  unsigned awaitingHandler_ GUARDED_BY(mutex_) = 0;
+  std::map<TimerKey, std::shared_ptr<Timer>> timersByDue_ GUARDED_BY(mutex_);
+  std::set<TimerKey> timersByLatest_ GUARDED_BY(mutex_);
+  MonotonicTime alarmAt_ GUARDED_BY(mutex_){};  // zero: not set
+  uint64_t nextTimer_ GUARDED_BY(mutex_) = 0;
+};
+
+bool EpollReactor::Registration::modify(unsigned events) {
+  return reactor_->modify(*this, events);
+}
+bool EpollReactor::Registration::rearm() {
+  return reactor_->rearm(*this);
+}
+void EpollReactor::Registration::cancel() {
+  reactor_->cancel(*this);
+}
+void EpollReactor::Timer::cancel() {
+  reactor_->cancel(*this);
+}
+
+bool EpollReactor::Implementation::start(const char* threadName) {
+  epoll_ = ownDescriptor(epoll_create1(EPOLL_CLOEXEC));
+  alarm_ = ownDescriptor(timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
+  stopEvent_ = makeEventDescriptor();
+  if (epoll_.get() < 0 || alarm_.get() < 0 || stopEvent_.get() < 0) return false;
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = kStopEvent;
+  if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, stopEvent_.get(), &event) != 0) return false;
+  event.events = EPOLLIN | EPOLLET;  // setting it anew clears it, so it is never read
+  event.data.u64 = kTimerEvent;
+  if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, alarm_.get(), &event) != 0) return false;
+  try {
+    thread_ = std::thread([this, threadName] {
+      beginServiceThread(threadName);
+      threadId_ = std::this_thread::get_id();
+      run();
+    });
+  } catch (const std::system_error& error) {
+    errno = error.code().value();
+    return false;
+  }
+  return true;
+}
+
+void EpollReactor::Implementation::stop() {
+  stopping_ = true;
+  if (thread_.joinable()) {
+    signalEventDescriptor(stopEvent_.get());
+    thread_.join();
+  }
+  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Task>>>
+      works;  // destroyed without the lock
+  std::map<TimerKey, std::shared_ptr<Timer>> dropped;
+  MutexLock lock(mutex_);
+  for (auto& [key, timer] : timersByDue_) {
+    timer->armed_ = false;
+    works.emplace_back(std::move(timer->queue_), std::move(timer->work_));
+  }
+  timersByLatest_.clear();
+  dropped.swap(timersByDue_);
+}
+
+void EpollReactor::Implementation::run() {
+  std::array<epoll_event, 128> events;
+  while (!stopping_) {
+    const int count = epoll_wait(epoll_.get(), events.data(), static_cast<int>(events.size()), -1);
+    wakeUps_.fetch_add(1, std::memory_order_relaxed);
+    bool due = false;
+    for (int i = 0; i < count && !stopping_; ++i) {
+      const uint64_t tag = events[static_cast<size_t>(i)].data.u64;
+      if (tag == kTimerEvent) {
+        due = true;
+      } else if (tag != kStopEvent) {
+        dispatch(tag, events[static_cast<size_t>(i)].events);
+      }
+    }
+    if (due && !stopping_) fireTimers();
+  }
+}
+
+void EpollReactor::Implementation::dispatch(uint64_t tag, uint32_t events) {
+  std::shared_ptr<Registration> registration;  // a handler may destroy its own watch
+  unsigned bits;
+  {
+    MutexLock lock(mutex_);
+    const Slot& slot = slots_[static_cast<uint32_t>(tag)];
+    if (slot.generation != tag >> 32 || slot.registration == nullptr) return;
+    bits = readyBits(events) & (slot.registration->events_ | ready::ended | ready::failed);
+    if (bits == 0) return;  // no longer asked for
+    registration = slot.registration;
+    running_ = registration.get();
+  }
+  registration->handler_(bits);
+  MutexLock lock(mutex_);
+  running_ = nullptr;
+  if (awaitingHandler_ > 0) handlerDone_.notifyAll();
+}
+
+bool EpollReactor::Implementation::control(int operation, const Registration& registration) {
+  epoll_event event{};
+  event.events = epollEvents(registration.events_);
+  event.data.u64 = uint64_t{slots_[registration.slot_].generation} << 32 | registration.slot_;
+  return epoll_ctl(epoll_.get(), operation, registration.descriptor_, &event) == 0;
+}
+
+Watch EpollReactor::Implementation::watch(int descriptor, unsigned events, Handler handler) {
+  auto registration =
+      std::make_shared<Registration>(shared_from_this(), descriptor, events, std::move(handler));
+  MutexLock lock(mutex_);
+  if (stopping_) return {};
+  if (freeSlots_.empty()) {
+    freeSlots_.push_back(static_cast<uint32_t>(slots_.size()));
+    slots_.emplace_back();
+  }
+  registration->slot_ = freeSlots_.back();
+  if (!control(EPOLL_CTL_ADD, *registration)) return {};
+  freeSlots_.pop_back();
+  registration->registered_ = true;
+  slots_[registration->slot_].registration = registration;
+  return Watch(registration);
+}
+
+bool EpollReactor::Implementation::modify(Registration& registration, unsigned events) {
+  MutexLock lock(mutex_);
+  if (!registration.registered_) return false;
+  registration.events_ = events;
+  return control(EPOLL_CTL_MOD, registration);
+}
+
+bool EpollReactor::Implementation::rearm(Registration& registration) {
+  MutexLock lock(mutex_);
+  return registration.registered_ && control(EPOLL_CTL_MOD, registration);
+}
+
+void EpollReactor::Implementation::cancel(Registration& registration) {
+  std::shared_ptr<Registration> dropped;  // destroyed without the lock
+  MutexLock lock(mutex_);
+  if (!registration.registered_) return;
+  registration.registered_ = false;
+  (void)control(EPOLL_CTL_DEL, registration);
+  Slot& slot = slots_[registration.slot_];
+  dropped = std::move(slot.registration);
+  ++slot.generation;
+  freeSlots_.push_back(registration.slot_);
+  if (threadId_.load() == std::this_thread::get_id()) return;
+  ++awaitingHandler_;
+  while (running_ == &registration) handlerDone_.wait(mutex_);
+  --awaitingHandler_;
+}
+
+TimerHandle EpollReactor::Implementation::arm(Duration delay, Duration period, Duration leeway,
+                                              std::shared_ptr<SerialQueue> queue, Task work) {
+  auto timer = std::make_shared<Timer>(shared_from_this(), period, leeway, std::move(queue), std::move(work));
+  timer->due_ = std::chrono::steady_clock::now() + std::clamp(delay, Duration::zero(), kLongest);
+  MutexLock lock(mutex_);
+  if (!stopping_) {
+    timer->id_ = nextTimer_++;
+    insert(timer);
+    setAlarm();
+  }
+  return TimerHandle(std::move(timer));
+}
+
+void EpollReactor::Implementation::insert(std::shared_ptr<Timer> timer) {
+  timer->armed_ = true;
+  timersByLatest_.emplace(timer->due_ + timer->leeway_, timer->id_);
+  const TimerKey key{timer->due_, timer->id_};
+  timersByDue_.emplace(key, std::move(timer));
+}
+
+std::shared_ptr<EpollReactor::Timer> EpollReactor::Implementation::remove(Timer& timer) {
+  timer.armed_ = false;
+  timersByLatest_.erase({timer.due_ + timer.leeway_, timer.id_});
+  return std::move(timersByDue_.extract({timer.due_, timer.id_}).mapped());
+}
+
+void EpollReactor::Implementation::cancel(Timer& timer) {
+  std::shared_ptr<Timer> dropped;  // destroyed without the lock
+  MutexLock lock(mutex_);
+  if (!timer.armed_) return;
+  dropped = remove(timer);
+  setAlarm();
+}
+
+void EpollReactor::Implementation::setAlarm() {
+  const MonotonicTime next = timersByLatest_.empty() ? MonotonicTime{} : timersByLatest_.begin()->first;
+  if (next == alarmAt_) return;
+  alarmAt_ = next;
+  const auto sinceEpoch = next.time_since_epoch();
+  const auto whole = std::chrono::floor<std::chrono::seconds>(sinceEpoch);
+  itimerspec setting{};  // all zero: off
+  setting.it_value.tv_sec = static_cast<time_t>(whole.count());
+  setting.it_value.tv_nsec = static_cast<long>((sinceEpoch - whole).count());
+  timerfd_settime(alarm_.get(), TFD_TIMER_ABSTIME, &setting, nullptr);
+}
+
+void EpollReactor::Implementation::fireTimers() {
+  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Task>>> due;
+  std::vector<std::shared_ptr<Timer>> timers;  // destroyed without the lock
+  {
+    MutexLock lock(mutex_);
+    const MonotonicTime now = std::chrono::steady_clock::now();
+    while (!timersByDue_.empty() && timersByDue_.begin()->first.first <= now)
+      timers.push_back(remove(*timersByDue_.begin()->second));
+    for (const std::shared_ptr<Timer>& timer : timers) {
+      if (timer->period_ <= Duration::zero()) {
+        due.emplace_back(std::move(timer->queue_), std::move(timer->work_));
+        continue;
+      }
+      due.emplace_back(timer->queue_, timer->work_);
+      timer->due_ += timer->period_ * ((now - timer->due_) / timer->period_ + 1);
+      insert(timer);
+    }
+    if (alarmAt_ <= now) alarmAt_ = {};  // it has gone off
+    setAlarm();
+  }
+  for (auto& [queue, work] : due) queue->async([work = std::move(work)] { (*work)(); });
+}
+
+std::unique_ptr<EpollReactor> EpollReactor::create(const char* threadName) {
+  auto implementation = std::make_shared<Implementation>();
+  if (!implementation->start(threadName)) return nullptr;
+  return std::unique_ptr<EpollReactor>(new EpollReactor(std::move(implementation)));
+}
+
+EpollReactor::EpollReactor(std::shared_ptr<Implementation> implementation)
+    : implementation_(std::move(implementation)) {}
+EpollReactor::~EpollReactor() {
+  stop();
+}
+void EpollReactor::stop() {
+  implementation_->stop();
+}
+uint64_t EpollReactor::wakeUps() const {
+  return implementation_->wakeUps();
+}
+
+Watch EpollReactor::watch(int descriptor, unsigned events, Handler handler) {
+  return implementation_->watch(descriptor, events, std::move(handler));
+}
+
+TimerHandle EpollReactor::after(Duration delay, std::shared_ptr<SerialQueue> queue, Task work) {
+  return implementation_->arm(delay, Duration::zero(), Duration::zero(), std::move(queue), std::move(work));
+}
+
+TimerHandle EpollReactor::every(Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue,
+                                Task work) {
+  period = std::clamp<Duration>(period, std::chrono::milliseconds(1), kLongest);
+  leeway = std::clamp(leeway, Duration::zero(), kLongest);
+  return implementation_->arm(period, period, leeway, std::move(queue), std::move(work));
+}
+
+}  // namespace kyt

@@ -1,0 +1,14 @@
+// The system's clocks.
+#pragma once
+
+#include "platform/Clock.h"
+
+namespace kyt {
+
+class LinuxClock final : public Clock {
+ public:
+  [[nodiscard]] TimeValue timeOfDay() const override;
+  [[nodiscard]] MonotonicTime monotonic() const override;
+};
+
+}  // namespace kyt
