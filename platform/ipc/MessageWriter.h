@@ -33,9 +33,9 @@ class MessageWriter {
   struct Call {
     std::string_view path = wire::kSessionPath;
     std::string_view interface = wire::kSessionInterface;
-    std::string_view member;
-    std::string_view destination;  // empty: none; peer to peer needs none
-    std::string_view signature;    // empty: no arguments
+    std::string_view member = {};
+    std::string_view destination = {};  // empty: none; peer to peer needs none
+    std::string_view signature = {};    // empty: no arguments
     bool expectsReply = true;
     uint32_t unixFds = 0;  // how many descriptors travel with the message's first byte
   };
