@@ -1,0 +1,24 @@
+// Makes text from outside safe to show: every log sink, the tools and the development server's page pass what
+// they write through this, so that nobody can forge a line or steer a terminal.
+//
+// Tab, line feed and carriage return become \t, \n and \r; other control characters (U+0000 to U+001F, U+007F
+// to U+009F), the line and paragraph separators, the marks that reorder text (U+202A to U+202E, U+2066 to
+// U+2069) and every byte that is no valid UTF-8 become \xHH, two lower-case digits a byte. A backslash stays
+// as it is: ordinary text is never changed. Any thread, no state.
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+
+namespace kyt {
+
+void appendEscaped(std::string& out, std::string_view text);
+[[nodiscard]] std::string escapedText(std::string_view text);
+// Whether escapedText() would change nothing.
+[[nodiscard]] bool isPlainText(std::string_view text);
+// The length of the valid UTF-8 sequence that `text` begins with, 0 when there is none.
+[[nodiscard]] size_t utf8SequenceLength(std::string_view text);
+[[nodiscard]] bool isValidUTF8(std::string_view text);
+
+}  // namespace kyt

@@ -1,0 +1,65 @@
+// Small files read whole, and the handle of a descriptor. For configuration, user defaults and bundles: a few
+// KiB each.
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <variant>
+
+namespace kyt {
+
+class FileHandle {
+ public:
+  FileHandle() = default;
+  explicit FileHandle(int fd) : fd_(fd) {}
+  FileHandle(FileHandle&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
+  FileHandle& operator=(FileHandle&& other) noexcept {
+    std::swap(fd_, other.fd_);
+    return *this;
+  }
+  ~FileHandle();
+  [[nodiscard]] int get() const { return fd_; }
+  [[nodiscard]] int release() { return std::exchange(fd_, -1); }
+  explicit operator bool() const { return fd_ >= 0; }
+
+ private:
+  int fd_ = -1;
+};
+
+// What tells one state of a file from another without reading it.
+struct FileIdentity {
+  uint64_t device = 0, inode = 0;
+  int64_t size = -1;  // -1: there is no such file
+  int64_t changedSeconds = 0, changedNanoseconds = 0, modifiedSeconds = 0, modifiedNanoseconds = 0;
+  uint32_t owner = 0, mode = 0;
+  [[nodiscard]] bool exists() const { return size >= 0; }
+  friend bool operator==(const FileIdentity&, const FileIdentity&) = default;
+};
+[[nodiscard]] FileIdentity identityOf(const struct stat& status);
+[[nodiscard]] FileIdentity identityOf(const std::string& path);  // follows symbolic links
+
+// A change within the same tick of the kernel's clock as the last one leaves no trace in the times, so what
+// was read from a file that changed this recently must be read again next time.
+[[nodiscard]] bool changedJustNow(const FileIdentity& identity);
+
+struct FileContents {
+  std::string bytes;
+  FileIdentity identity;
+};
+// The whole file, or what is wrong as text (the system's word, "is no regular file", "is too large").
+[[nodiscard]] std::variant<FileContents, std::string> readRegularFile(const std::string& path,
+                                                                      size_t maxBytes);
+
+// Makes a folder and its missing parents (mode 0755 for parents). No value: it is there now.
+[[nodiscard]] std::optional<std::string> makeFolders(const std::string& path, uint32_t mode);
+// All bytes, through interruptions. False: errno says why.
+[[nodiscard]] bool writeAll(int fd, std::string_view bytes);
+[[nodiscard]] std::string errorText(int error);
+
+}  // namespace kyt

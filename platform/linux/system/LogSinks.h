@@ -1,0 +1,42 @@
+// The real log sinks: the journal and standard error. Both escape what may hold anything
+// (platform/TextEscape.h), so one call is one line. Any thread; a line that cannot be written is lost, since
+// there is nowhere to say so.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/Log.h"
+#include "platform/Settings.h"
+
+namespace kyt {
+
+// A line each, in one write: "<7>" in front for debug, "<6>" for default, "<3>" for error.
+class StderrSink final : public LogSink {
+ public:
+  explicit StderrSink(int fd = 2) : fd_(fd) {}
+  void write(LogLevel level, std::string_view line) override;
+
+ private:
+  const int fd_;
+};
+
+// Entries with MESSAGE, PRIORITY (7, 6, 3), SYSLOG_IDENTIFIER and KYT_OPERATION (what stands before the first
+// colon). What the journal does not take goes to standard error.
+class JournalSink final : public LogSink {
+ public:
+  explicit JournalSink(std::string identifier = "kytreportingd") : identifier_(std::move(identifier)) {}
+  void write(LogLevel level, std::string_view line) override;
+  // Whether the journal's socket is there.
+  [[nodiscard]] static bool isAvailable();
+
+ private:
+  const std::string identifier_;
+  StderrSink fallback_;
+};
+
+// The journal when its socket is there and standard error was not asked for.
+[[nodiscard]] std::unique_ptr<LogSink> makeLogSink(LogTarget target);
+
+}  // namespace kyt

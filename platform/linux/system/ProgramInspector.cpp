@@ -1,0 +1,108 @@
+#include "platform/linux/system/ProgramInspector.h"
+
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/time.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+
+namespace kyt {
+namespace {
+
+struct Answer {
+  int32_t error = 0;
+  int32_t pid = 0;  // of the question, so that an answer that came too late is not taken for another's
+  ProgramIdentity program;
+};
+
+// Nothing here allocates or takes a lock: it runs in a forked process.
+Answer inspect(int32_t pid) {
+  char path[32];
+  std::snprintf(path, sizeof path, "/proc/%d/exe", pid);
+  Answer answer;
+  answer.pid = pid;
+  struct stat status = {};
+  if (pid <= 0) {
+    answer.error = ESRCH;
+  } else if (::stat(path, &status) != 0) {
+    answer.error = errno;
+  } else {
+    answer.program = {status.st_dev, status.st_ino};
+  }
+  return answer;
+}
+
+[[noreturn]] void serve(int socket) {
+  // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
+  ::signal(SIGINT, SIG_IGN);
+  ::signal(SIGTERM, SIG_IGN);
+  ::signal(SIGHUP, SIG_IGN);
+  ::signal(SIGPIPE, SIG_IGN);
+  ::prctl(PR_SET_NAME, "kyt-inspector");
+  ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
+  if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
+  ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
+  while (true) {
+    int32_t pid = 0;
+    const ssize_t count = ::recv(socket, &pid, sizeof pid, 0);
+    if (count < 0 && errno == EINTR) continue;
+    if (count <= 0) ::_exit(0);
+    const Answer answer = inspect(count == sizeof pid ? pid : 0);
+    (void)::send(socket, &answer, sizeof answer, MSG_NOSIGNAL);
+  }
+}
+
+std::variant<ProgramIdentity, int> resultOf(const Answer& answer) {
+  if (answer.error != 0) return answer.error;
+  return answer.program;
+}
+
+}  // namespace
+
+std::variant<ProgramIdentity, int> DirectProgramInspector::runningProgram(int32_t pid) {
+  return resultOf(inspect(pid));
+}
+
+std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspectorProcess::start() {
+  int ends[2];
+  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
+    return "socketpair: " + errorText(errno);
+  FileHandle mine(ends[0]), theirs(ends[1]);
+  const pid_t child = ::fork();
+  if (child < 0) return "fork: " + errorText(errno);
+  if (child == 0) serve(theirs.get());
+  const timeval patience = {2, 0};
+  ::setsockopt(mine.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  ::setsockopt(mine.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+  return std::unique_ptr<ProgramInspectorProcess>(new ProgramInspectorProcess(std::move(mine), child));
+}
+
+ProgramInspectorProcess::~ProgramInspectorProcess() {
+  {
+    MutexLock lock(mutex_);
+    const FileHandle closed = std::move(socket_);
+  }
+  int status = 0;
+  while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
+  }
+}
+
+std::variant<ProgramIdentity, int> ProgramInspectorProcess::runningProgram(int32_t pid) {
+  MutexLock lock(mutex_);
+  if (::send(socket_.get(), &pid, sizeof pid, MSG_NOSIGNAL) != sizeof pid) return EIO;
+  while (true) {
+    Answer answer;
+    const ssize_t count = ::recv(socket_.get(), &answer, sizeof answer, 0);
+    if (count < 0 && errno == EINTR) continue;
+    if (count != sizeof answer) return count < 0 && errno == EAGAIN ? ETIMEDOUT : EIO;
+    if (answer.pid == pid) return resultOf(answer);
+  }
+}
+
+}  // namespace kyt

@@ -1,0 +1,55 @@
+// Which program file a process runs, as device and inode. Entitlements ask it about a connection's peer.
+//
+// A confined process cannot ask: Landlock keeps it from looking at processes outside its own confinement,
+// whatever its privileges. So a small process is forked before the confinement is entered and asks on the
+// daemon's behalf. It knows one question, takes a process number and answers two numbers; it ends when the
+// daemon does.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <variant>
+
+#include "platform/Mutex.h"
+#include "platform/linux/system/Files.h"
+
+namespace kyt {
+
+struct ProgramIdentity {
+  uint64_t device = 0, inode = 0;
+  friend bool operator==(const ProgramIdentity&, const ProgramIdentity&) = default;
+};
+
+// Any thread.
+class ProgramInspector {
+ public:
+  virtual ~ProgramInspector() = default;
+  // The program of the process that has this number now, or errno (EACCES: not allowed to know). The caller
+  // makes sure afterwards that the process it means was still alive.
+  [[nodiscard]] virtual std::variant<ProgramIdentity, int> runningProgram(int32_t pid) = 0;
+};
+
+// Asks itself: for processes that are not confined.
+class DirectProgramInspector final : public ProgramInspector {
+ public:
+  [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override;
+};
+
+class ProgramInspectorProcess final : public ProgramInspector {
+ public:
+  // Only before there are threads and before the confinement. An error's text when it cannot be started.
+  [[nodiscard]] static std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> start();
+  ~ProgramInspectorProcess() override;  // ends the process and waits for it
+  // Waits for the answer, two seconds at most.
+  [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(mutex_);
+
+ private:
+  ProgramInspectorProcess(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
+
+  Mutex mutex_;
+  FileHandle socket_ GUARDED_BY(mutex_);
+  const int32_t child_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,17 @@
+// kytreportingd.toml. Everything is checked: an unknown section or key, a wrong type or a number out of range
+// is an error with file and line, since a setting that is silently ignored is found out too late.
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <variant>
+
+#include "platform/Settings.h"
+#include "platform/linux/system/Toml.h"
+
+namespace kyt {
+
+[[nodiscard]] std::variant<Settings, TomlError> readSettings(const std::string& path);
+[[nodiscard]] std::variant<Settings, TomlError> parseSettings(std::string_view text, std::string_view name);
+
+}  // namespace kyt
