@@ -1,0 +1,157 @@
+#include "platform/linux/system/TomlSettings.h"
+
+#include <gtest/gtest.h>
+
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+constexpr char kHosts[] =
+    "[storebag]\ninternal_host = \"https://a.example\"\npublic_host = \"https://b.example\"\n";
+
+Settings parsed(const std::string& text) {
+  auto result = parseSettings(text, "k.toml");
+  if (const auto* error = std::get_if<TomlError>(&result)) ADD_FAILURE() << error->text;
+  return std::holds_alternative<Settings>(result) ? std::get<Settings>(result) : Settings{};
+}
+
+std::string errorOf(const std::string& text) {
+  auto result = parseSettings(text, "k.toml");
+  return std::holds_alternative<TomlError>(result) ? std::get<TomlError>(result).text : "no error";
+}
+
+TEST(TomlSettings, TheTwoHostsAreEnough) {
+  const Settings settings = parsed(kHosts);
+  EXPECT_EQ(settings.storebagInternalHost, "https://a.example");
+  EXPECT_EQ(settings.storebagPublicHost, "https://b.example");
+  EXPECT_EQ(settings.caFile, "");
+  EXPECT_TRUE(settings.cellularInterfaces.empty());
+  EXPECT_EQ(settings.logTarget, LogTarget::automatic);
+  const Limits defaults;
+  EXPECT_EQ(settings.limits.maxMessageBytes, defaults.maxMessageBytes);
+  EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 16777216u);
+  EXPECT_EQ(settings.limits.idleExitSeconds, 30);
+}
+
+TEST(TomlSettings, EveryKeyIsTaken) {
+  const Settings settings = parsed(std::string(kHosts) + R"(
+[tls]
+ca_file = "/etc/ca.pem"
+[network]
+cellular_interfaces = ["wwan*", "ppp0"]
+[limits]
+max_message_bytes = 11
+max_queued_bytes = 12
+max_connections = 13
+max_connections_per_user = 14
+max_upload_bytes = 15
+max_batch_bytes = 16
+max_hierarchy_tokens_per_user = 17
+max_shared_data_bytes_per_user = 18
+[service]
+idle_exit_seconds = 1.5
+shutdown_grace_seconds = 2
+[log]
+target = "stderr"
+)");
+  EXPECT_EQ(settings.caFile, "/etc/ca.pem");
+  EXPECT_EQ(settings.cellularInterfaces, (std::vector<std::string>{"wwan*", "ppp0"}));
+  EXPECT_EQ(settings.limits.maxMessageBytes, 11u);
+  EXPECT_EQ(settings.limits.maxQueuedBytes, 12u);
+  EXPECT_EQ(settings.limits.maxConnections, 13u);
+  EXPECT_EQ(settings.limits.maxConnectionsPerUser, 14u);
+  EXPECT_EQ(settings.limits.maxUploadBytes, 15u);
+  EXPECT_EQ(settings.limits.maxBatchBytes, 16u);
+  EXPECT_EQ(settings.limits.maxHierarchyTokensPerUser, 17u);
+  EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 18u);
+  EXPECT_EQ(settings.limits.idleExitSeconds, 1.5);
+  EXPECT_EQ(settings.limits.shutdownGraceSeconds, 2.0);
+  EXPECT_EQ(settings.logTarget, LogTarget::standardError);
+}
+
+TEST(TomlSettings, AHostsTrailingSlashIsDropped) {
+  EXPECT_EQ(parsed("[storebag]\ninternal_host = 'http://localhost:80/'\npublic_host = 'https://b//'\n")
+                .storebagInternalHost,
+            "http://localhost:80");
+}
+
+TEST(TomlSettings, BothHostsAreRequired) {
+  EXPECT_EQ(errorOf(""), "k.toml: \"storebag.internal_host\" is missing");
+  EXPECT_EQ(errorOf("[storebag]\ninternal_host = 'https://a'\n"),
+            "k.toml: \"storebag.public_host\" is missing");
+}
+
+TEST(TomlSettings, UnknownKeysAndSectionsAreErrorsWithTheirLine) {
+  EXPECT_EQ(errorOf(std::string(kHosts) + "[limits]\nmax_message_byte = 1\n"),
+            "k.toml:5: unknown key \"limits.max_message_byte\"");
+  EXPECT_EQ(errorOf(std::string(kHosts) + "\n[limit]\n"), "k.toml:5: unknown section or key \"limit\"");
+  EXPECT_EQ(errorOf("log = 1\n" + std::string(kHosts)), "k.toml:1: \"log\" must be a section");
+}
+
+TEST(TomlSettings, WrongTypesAndNumbersOutOfRangeAreErrorsWithTheirLine) {
+  const auto limit = [](const std::string& line) {
+    return errorOf(std::string(kHosts) + "[limits]\n" + line + "\n");
+  };
+  const std::string count = "k.toml:5: \"limits.max_batch_bytes\" must be a whole number of at least 1";
+  EXPECT_EQ(limit("max_batch_bytes = \"1\""), count);
+  EXPECT_EQ(limit("max_batch_bytes = 0"), count);
+  EXPECT_EQ(limit("max_batch_bytes = -5"), count);
+  EXPECT_EQ(limit("max_batch_bytes = 1.0"), count);
+  EXPECT_EQ(limit("max_message_bytes = 134217729"), "k.toml:5: \"limits.max_message_bytes\" is too large");
+  const auto other = [](const std::string& lines) { return errorOf(std::string(kHosts) + lines); };
+  EXPECT_NE(
+      other("[service]\nidle_exit_seconds = -1\n").find("k.toml:5: \"service.idle_exit_seconds\" must be"),
+      std::string::npos);
+  EXPECT_NE(other("[service]\nidle_exit_seconds = nan\n").find("must be a number of seconds"),
+            std::string::npos);
+  EXPECT_EQ(other("[log]\ntarget = \"file\"\n"),
+            "k.toml:5: \"log.target\" must be \"auto\", \"journal\" or \"stderr\"");
+  EXPECT_EQ(other("[tls]\nca_file = \"ca.pem\"\n"),
+            "k.toml:5: \"tls.ca_file\" must be the absolute path of a file");
+  EXPECT_EQ(other("[network]\ncellular_interfaces = \"wwan0\"\n"),
+            "k.toml:5: \"network.cellular_interfaces\" must be an array of texts");
+  EXPECT_NE(other("[network]\ncellular_interfaces = [1]\n").find("k.toml:5:"), std::string::npos);
+}
+
+TEST(TomlSettings, HostsMustBeAddresses) {
+  const auto hostError = [](const std::string& host) {
+    return errorOf("[storebag]\ninternal_host = \"" + host + "\"\npublic_host = 'https://b'\n");
+  };
+  for (const char* host : {"bags.example.org", "https://", "ftp://a", "https:///path", ""}) {
+    EXPECT_EQ(hostError(host),
+              "k.toml:2: \"storebag.internal_host\" must be an address like \"https://bags.example.org\"")
+        << host;
+  }
+  EXPECT_EQ(hostError("https://a b"),
+            "k.toml:2: \"storebag.internal_host\" must hold no blank and no control character");
+}
+
+TEST(TomlSettings, BrokenTextIsAnErrorWithItsLineInOnePlainLine) {
+  const std::string error = errorOf("[storebag]\ninternal_host = \n");
+  EXPECT_EQ(error.find("k.toml:2: "), 0u) << error;
+  const std::string control = errorOf("[storebag]\n\x1b[2J = 1\n");
+  EXPECT_EQ(control.find('\x1b'), std::string::npos) << control;
+  EXPECT_EQ(control.find('\n'), std::string::npos) << control;
+}
+
+TEST(TomlSettings, DeepNestingIsAnErrorAndNoOverflow) {
+  EXPECT_NE(errorOf("a = " + std::string(100000, '[')).find("k.toml:1: "), std::string::npos);
+  std::string dotted = "a";
+  for (int i = 0; i < 100000; ++i) dotted += ".a";
+  EXPECT_EQ(errorOf(dotted + " = 1"), "k.toml:1: too many dots");
+}
+
+TEST(TomlSettings, FilesThatCannotBeReadAreErrors) {
+  const TemporaryFolder folder;
+  const auto error = [](const std::string& path) { return std::get<TomlError>(readSettings(path)).text; };
+  EXPECT_EQ(error(folder / "none.toml"), (folder / "none.toml") + ": No such file or directory");
+  EXPECT_EQ(error(folder.path()), folder.path() + ": is no regular file");
+  EXPECT_EQ(error(folder.write("big.toml", std::string(kMaxTomlBytes + 1, '#'))),
+            (folder / "big.toml") + ": is too large");
+  const auto good = readSettings(folder.write("good.toml", kHosts));
+  EXPECT_TRUE(std::holds_alternative<Settings>(good));
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,330 @@
+#include "platform/linux/system/TomlUserDefaults.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <functional>
+#include <set>
+
+#include "platform/Limits.h"
+#include "platform/fake/ManualClock.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+constexpr char kDomain[] = "com.vantu.kytreporting";
+constexpr char kFile[] = "com.vantu.kytreporting.toml";
+
+// A step at which this process is to die, for the crash tests.
+const char* dieAt = nullptr;
+void dieAtStep(const char* step) {
+  if (dieAt != nullptr && std::string_view(step) == dieAt) ::raise(SIGKILL);
+}
+
+class TomlUserDefaultsTest : public testing::Test {
+ protected:
+  TomlUserDefaults make(Duration lockWait = std::chrono::seconds(5), void (*step)(const char*) = nullptr) {
+    return TomlUserDefaults({folder_.path(), lockWait, step}, log_, counters_, clock_);
+  }
+  std::string text() const { return folder_.read(kFile); }
+
+  TemporaryFolder folder_;
+  MemoryLogSink sink_;
+  Log log_{sink_, LogLevel::debug};
+  Counters counters_;
+  ManualClock clock_;
+};
+
+// Runs `work` in a process of its own and answers how it ended (as waitpid says).
+int inChild(const std::function<int()>& work) {
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(work());
+  int status = 0;
+  while (::waitpid(child, &status, 0) < 0 && errno == EINTR) {
+  }
+  return status;
+}
+
+TEST_F(TomlUserDefaultsTest, AnswersWhatAnAdministratorWrote) {
+  folder_.write(kFile, "environmentType = 2\nforceEventLogging = true\nratio = 0.5\n\"uuid:a:b\" = \"X\"\n");
+  auto defaults = make();
+  EXPECT_EQ(defaults.value(kDomain, "environmentType"), Value(2));
+  EXPECT_EQ(defaults.value(kDomain, "forceEventLogging").boolean(), true);
+  EXPECT_EQ(defaults.value(kDomain, "ratio").real(), 0.5);
+  EXPECT_EQ(defaults.value(kDomain, "uuid:a:b"), Value("X"));
+  EXPECT_TRUE(defaults.value(kDomain, "none").isNull());
+  EXPECT_TRUE(defaults.value("com.vantu.timed", "environmentType").isNull());
+  EXPECT_TRUE(sink_.lines().empty());
+}
+
+TEST_F(TomlUserDefaultsTest, AChangeCountsAtOnceAlsoWithinOneTick) {
+  auto defaults = make();
+  for (int i = 0; i < 200; ++i) {  // written in place, same size: only the times can tell
+    folder_.write(kFile, "n = " + std::to_string(100 + i) + "\n");
+    ASSERT_EQ(defaults.value(kDomain, "n"), Value(100 + i));
+  }
+  ::unlink((folder_ / kFile).c_str());
+  EXPECT_TRUE(defaults.value(kDomain, "n").isNull());
+}
+
+TEST_F(TomlUserDefaultsTest, StoresEveryKindAndReadsItBack) {
+  auto defaults = make();
+  const std::pair<const char*, Value> values[] = {
+      {"text", Value("a \"quoted\" \\ line\nbreak \x01\x7f \u00fc")},
+      {"yes", Value(true)},
+      {"whole", Value(-7)},
+      {"large", Value(static_cast<unsigned long>(INT64_MAX))},
+      {"real", Value(2.0)},
+      {"tiny", Value(1e-300)},
+      {"key with \"quotes\" and .", Value("v")},
+  };
+  for (const auto& [key, value] : values) EXPECT_EQ(defaults.set(kDomain, key, value), std::nullopt) << key;
+  auto other = make();
+  for (const auto& [key, value] : values) EXPECT_EQ(other.value(kDomain, key), value) << key;
+  EXPECT_EQ(other.value(kDomain, "real").kind(), Value::Kind::real);
+  EXPECT_EQ(other.values(kDomain).size(), std::size(values));
+}
+
+TEST_F(TomlUserDefaultsTest, RefusesWhatAFileCannotHold) {
+  auto defaults = make();
+  ASSERT_EQ(defaults.set(kDomain, "kept", Value(1)), std::nullopt);
+  const std::string before = text();
+  EXPECT_NE(defaults.set(kDomain, "a", Value(Array{Value(1)})), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "a", Value(Dictionary())), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "a", Value(UINT64_MAX)), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "a", Value("\xff")), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "\xff", Value(1)), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "", Value(1)), std::nullopt);
+  EXPECT_NE(defaults.set(kDomain, "a", Value(std::string(kMaxTomlBytes, 'x'))), std::nullopt);
+  EXPECT_EQ(text(), before);
+}
+
+TEST_F(TomlUserDefaultsTest, KeepsRemarksOrderAndOtherLines) {
+  folder_.write(kFile, "# ours\nb = 1 # why\n\nlong = \"\"\"\nx\ny\"\"\"\na = 2");
+  auto defaults = make();
+  EXPECT_EQ(defaults.set(kDomain, "long", Value("short")), std::nullopt);
+  EXPECT_EQ(defaults.set(kDomain, "new", Value(true)), std::nullopt);
+  EXPECT_EQ(text(), "# ours\nb = 1 # why\n\nlong = \"short\"\na = 2\nnew = true\n");
+  EXPECT_EQ(defaults.set(kDomain, "b", Value()), std::nullopt);
+  EXPECT_EQ(defaults.set(kDomain, "none", Value()), std::nullopt);
+  EXPECT_EQ(text(), "# ours\n\nlong = \"short\"\na = 2\nnew = true\n");
+}
+
+TEST_F(TomlUserDefaultsTest, KeepsOwnerAndMode) {
+  const std::string file = folder_.write(kFile, "a = 1\n", 0604);
+  const bool isRoot = ::geteuid() == 0;
+  if (isRoot) {
+    ASSERT_EQ(::chown(file.c_str(), 1234, 4321), 0);
+  }
+  auto defaults = make();
+  ASSERT_EQ(defaults.set(kDomain, "a", Value(2)), std::nullopt);
+  struct stat status = {};
+  ASSERT_EQ(::stat(file.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0604u);
+  if (isRoot) {
+    EXPECT_EQ(status.st_uid, 1234u);
+    EXPECT_EQ(status.st_gid, 4321u);
+  }
+}
+
+TEST_F(TomlUserDefaultsTest, ANewFileBelongsToTheFoldersOwner) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  ASSERT_EQ(::chown(folder_.path().c_str(), 1234, 4321), 0);
+  auto defaults = make();
+  ASSERT_EQ(defaults.set(kDomain, "a", Value(2)), std::nullopt);
+  for (const char* name : {kFile, "com.vantu.kytreporting.lock"}) {
+    struct stat status = {};
+    ASSERT_EQ(::stat((folder_ / name).c_str(), &status), 0);
+    EXPECT_EQ(status.st_uid, 1234u) << name;
+    EXPECT_EQ(status.st_gid, 4321u) << name;
+    EXPECT_EQ(status.st_mode & 0007, 0u) << name;
+  }
+}
+
+TEST_F(TomlUserDefaultsTest, ABadFileAnswersNothingIsToldOnceAndNeverOverwritten) {
+  for (const char* bad :
+       {"a = \n", "[section]\na = 1\n", "a = [1]\n", "a.b = 1\n", "d = 2026-01-31\n", "a = \"\xff\"\n"}) {
+    sink_.clear();
+    const uint64_t before = counters_.value(Reason::badUserDefaultsFile);
+    auto defaults = make();
+    const std::string file = folder_.write(kFile, bad);
+    for (int i = 0; i < 3; ++i) EXPECT_TRUE(defaults.value(kDomain, "a").isNull()) << bad;
+    EXPECT_EQ(sink_.count(LogLevel::error, "userDefaults: " + file + ":"), 1u) << bad;
+    EXPECT_EQ(sink_.lines().size(), 1u) << bad;
+    EXPECT_EQ(counters_.value(Reason::badUserDefaultsFile), before + 1) << bad;
+    EXPECT_NE(defaults.set(kDomain, "a", Value(1)), std::nullopt) << bad;
+    EXPECT_EQ(text(), bad);
+  }
+  auto defaults = make();
+  EXPECT_TRUE(defaults.value(kDomain, "a").isNull());
+  folder_.write(kFile, "a = 1\n");
+  EXPECT_EQ(defaults.value(kDomain, "a"), Value(1));
+}
+
+TEST_F(TomlUserDefaultsTest, AFolderOrALinkInTheFilesPlaceIsNoFile) {
+  std::filesystem::create_directory(folder_ / kFile);
+  auto defaults = make();
+  EXPECT_TRUE(defaults.value(kDomain, "a").isNull());
+  EXPECT_EQ(sink_.count("is no regular file"), 1u);
+  EXPECT_NE(defaults.set(kDomain, "a", Value(1)), std::nullopt);
+  std::filesystem::remove(folder_ / kFile);
+  folder_.write("elsewhere", "a = 1\n");
+  std::filesystem::create_symlink(folder_ / "elsewhere", folder_ / kFile);
+  EXPECT_NE(defaults.set(kDomain, "a", Value(2)), std::nullopt);
+  EXPECT_EQ(folder_.read("elsewhere"), "a = 1\n");
+}
+
+TEST_F(TomlUserDefaultsTest, DomainNamesCannotLeaveTheFolder) {
+  auto defaults = make();
+  for (const char* domain : {"", ".", "..", "a/b", "../x", ".hidden", "a..b", "a b", "a\n"}) {
+    EXPECT_FALSE(TomlUserDefaults::isDomainName(domain)) << domain;
+    EXPECT_TRUE(defaults.value(domain, "a").isNull());
+    EXPECT_NE(defaults.set(domain, "a", Value(1)), std::nullopt);
+  }
+  EXPECT_FALSE(TomlUserDefaults::isDomainName(std::string(129, 'a')));
+  EXPECT_TRUE(TomlUserDefaults::isDomainName("com.vantu.kyt-reporting_2"));
+  EXPECT_TRUE(std::filesystem::is_empty(folder_.path()));
+}
+
+TEST_F(TomlUserDefaultsTest, MakesItsFolderWhenSomethingIsStored) {
+  TomlUserDefaults defaults({folder_ / "a/b/defaults"}, log_, counters_, clock_);
+  EXPECT_TRUE(defaults.value(kDomain, "a").isNull());
+  EXPECT_EQ(defaults.set(kDomain, "a", Value(1)), std::nullopt);
+  EXPECT_EQ(defaults.value(kDomain, "a"), Value(1));
+}
+
+TEST_F(TomlUserDefaultsTest, StoresAnIdentifierOnce) {
+  auto defaults = make();
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("one")), "one");
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("two")), "one");
+  EXPECT_EQ(make().stringOrStore(kDomain, "uuid:a:b", String("three")), "one");
+  EXPECT_EQ(defaults.set(kDomain, "uuid:a:b", Value(5)), std::nullopt);
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("four")), "four");
+}
+
+TEST_F(TomlUserDefaultsTest, RefusesIdentifiersPastTheLimitAndCountsThem) {
+  std::string full;
+  for (size_t i = 0; i < Limits::maxCustomIdentifiers; ++i)
+    full += "\"uuid:" + std::to_string(i) + ":\" = \"x\"\n";
+  folder_.write(kFile, full);
+  auto defaults = make();
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:new:", String("fresh")), "fresh");
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:new:", String("fresher")), "fresher");
+  EXPECT_EQ(counters_.value(Reason::customIdentifierRefused), 2u);
+  EXPECT_EQ(sink_.count(LogLevel::error, "userDefaults: An identifier was not stored: there are 1000 custom"),
+            1u);
+  EXPECT_EQ(text(), full);
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:7:", String("y")), "x");
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuidRespectDnu", String("own")), "own");
+  EXPECT_EQ(defaults.value(kDomain, "uuidRespectDnu"), Value("own"));
+}
+
+TEST_F(TomlUserDefaultsTest, RefusesAnIdentifierWithAVeryLongName) {
+  auto defaults = make();
+  const std::string key = "uuid:" + std::string(TomlUserDefaults::kMaxIdentifierKey, 'n');
+  EXPECT_EQ(defaults.stringOrStore(kDomain, key, String("fresh")), "fresh");
+  EXPECT_EQ(counters_.value(Reason::customIdentifierRefused), 1u);
+  EXPECT_TRUE(defaults.value(kDomain, key).isNull());
+}
+
+TEST_F(TomlUserDefaultsTest, GivesUpWhenTheLockIsHeldForTooLong) {
+  folder_.write("com.vantu.kytreporting.lock", "");
+  const FileHandle held(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
+  ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
+  auto defaults = make(std::chrono::milliseconds(20));
+  EXPECT_NE(defaults.set(kDomain, "a", Value(1)), std::nullopt);
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("x")), "x");
+  EXPECT_EQ(counters_.value(Reason::customIdentifierRefused), 1u);
+  EXPECT_TRUE(defaults.value(kDomain, "uuid:a:b").isNull());
+  ASSERT_EQ(::flock(held.get(), LOCK_UN), 0);
+  EXPECT_EQ(defaults.set(kDomain, "a", Value(1)), std::nullopt);
+}
+
+TEST_F(TomlUserDefaultsTest, ACrashAtAnyStepLeavesTheOldOrTheNewContent) {
+  for (const char* step : {"locked", "created", "written", "synced", "renamed", "done"}) {
+    folder_.write(kFile, "a = \"old\"\n");
+    const int status = inChild([&] {
+      dieAt = step;
+      auto defaults = make(std::chrono::seconds(5), dieAtStep);
+      (void)defaults.set(kDomain, "a", Value("new"));
+      return 0;
+    });
+    ASSERT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << step;
+    const bool isNew = std::string_view(step) == "renamed" || std::string_view(step) == "done";
+    EXPECT_EQ(text(), isNew ? "a = \"new\"\n" : "a = \"old\"\n") << step;
+    auto defaults = make(std::chrono::milliseconds(50));
+    EXPECT_EQ(defaults.set(kDomain, "b", Value(1)), std::nullopt)
+        << step;  // neither lock nor left-over is in the way
+    EXPECT_EQ(defaults.value(kDomain, "b"), Value(1)) << step;
+    EXPECT_FALSE(std::filesystem::exists(folder_ / ".com.vantu.kytreporting.toml.new")) << step;
+  }
+}
+
+TEST_F(TomlUserDefaultsTest, WritersOfSeveralProcessesLoseNothing) {
+  constexpr int kProcesses = 4, kWrites = 25;
+  std::vector<pid_t> children;
+  for (int process = 0; process < kProcesses; ++process) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      auto defaults = make(std::chrono::seconds(60));
+      int failures = 0;
+      for (int i = 0; i < kWrites; ++i) {
+        const std::string key = "p" + std::to_string(process) + "-" + std::to_string(i);
+        if (defaults.set(kDomain, key, Value(i))) ++failures;
+        if (defaults.value(kDomain, key) != Value(i)) ++failures;
+      }
+      ::_exit(failures == 0 ? 0 : 1);
+    }
+    children.push_back(child);
+  }
+  for (pid_t child : children) {
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  }
+  EXPECT_EQ(make().values(kDomain).size(), static_cast<size_t>(kProcesses * kWrites));
+}
+
+TEST_F(TomlUserDefaultsTest, ProcessesThatRaceForAnIdentifierAgree) {
+  constexpr int kProcesses = 6;
+  int ends[2];
+  ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+  std::vector<pid_t> children;
+  for (int process = 0; process < kProcesses; ++process) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      auto defaults = make(std::chrono::seconds(60));
+      std::string answers;
+      for (int i = 0; i < 10; ++i) {
+        const std::string own(1, static_cast<char>('a' + process));
+        answers += defaults.stringOrStore(kDomain, "uuid:" + std::to_string(i), String(std::string_view(own)))
+                       .view();
+      }
+      ::_exit(writeAll(ends[1], answers) ? 0 : 1);
+    }
+    children.push_back(child);
+  }
+  for (pid_t child : children) {
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  }
+  std::set<std::string> answers;
+  char buffer[10];
+  for (int process = 0; process < kProcesses; ++process) {
+    ASSERT_EQ(::read(ends[0], buffer, sizeof buffer), 10);
+    answers.emplace(buffer, sizeof buffer);
+  }
+  EXPECT_EQ(answers.size(), 1u) << "every process was answered the same identifiers";
+  ::close(ends[0]);
+  ::close(ends[1]);
+}
+
+}  // namespace
+}  // namespace kyt
