@@ -1,0 +1,42 @@
+// Deflate whose every call can be made to fail, for the failure paths of payload compression. In front of a
+// real one it passes on what is not told to fail; alone it "compresses" by copying. Set the faults before
+// streams are made; one thread.
+#pragma once
+
+#include <deque>
+#include <optional>
+
+#include "platform/Deflate.h"
+
+namespace kyt {
+
+class FaultyDeflate : public Deflate {
+ public:
+  struct Faults {
+    std::optional<int> initialize;  // the result of initialize(), which then does nothing else
+    std::deque<int> finish;         // the results of the next calls of finish(), which then do nothing else
+    std::optional<size_t> bound;    // what bound() answers
+    const char* message = nullptr;  // what message() answers, if not null
+    bool noStream = false;          // newStream() answers null
+  };
+  struct Calls {
+    int streams = 0;
+    int initialized = 0;
+    int finished = 0;
+    int ended = 0;
+    int level = 0;  // of the last initialize()
+    int windowBits = 0;
+    int memoryLevel = 0;
+  };
+
+  explicit FaultyDeflate(Deflate* inner = nullptr) : inner_(inner) {}
+  [[nodiscard]] std::unique_ptr<DeflateStream> newStream() override;
+
+  Faults faults;
+  Calls calls;
+
+ private:
+  Deflate* inner_;
+};
+
+}  // namespace kyt

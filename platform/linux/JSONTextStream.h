@@ -1,0 +1,129 @@
+// RapidJSON's output stream onto a std::string, by way of a buffer on the stack: appending single characters
+// to a string costs a check of its capacity each, and growing it by resize() would fill what is about to be
+// overwritten. Used by RapidJSONWriter.cpp alone.
+#pragma once
+
+#include <bit>
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <string_view>
+
+namespace kyt {
+
+class JSONTextStream {
+ public:
+  using Ch = char;
+
+  explicit JSONTextStream(std::string& out) : out_(out) {}
+  JSONTextStream(const JSONTextStream&) = delete;
+  JSONTextStream& operator=(const JSONTextStream&) = delete;
+  ~JSONTextStream() { Flush(); }
+
+  void Put(char c) {
+    if (next_ == buffer_ + kSize) Flush();
+    *next_++ = c;
+  }
+  void Flush() {
+    out_.append(buffer_, static_cast<size_t>(next_ - buffer_));
+    next_ = buffer_;
+  }
+
+  // Room for that many characters, kSize at most, to be taken with advance().
+  char* room(size_t size) {
+    if (static_cast<size_t>(buffer_ + kSize - next_) < size) Flush();
+    return next_;
+  }
+  void advance(char* end) { next_ = end; }
+
+  void append(std::string_view text) {
+    if (text.size() > kSize) {
+      Flush();
+      out_.append(text);
+      return;
+    }
+    char* to = room(text.size());
+    if (!text.empty()) std::memcpy(to, text.data(), text.size());
+    next_ = to + text.size();
+  }
+
+  // The text in quotation marks, escaped as RapidJSON escapes.
+  void appendQuoted(std::string_view text) {
+    Put('"');
+    while (text.size() > kPiece) {
+      appendEscaped(text.data(), text.data() + kPiece);
+      text.remove_prefix(kPiece);
+    }
+    appendEscaped(text.data(), text.data() + text.size());
+    Put('"');
+  }
+
+ private:
+  static constexpr size_t kSize = 4096;
+  static constexpr size_t kPiece = (kSize - 16) / 6;  // of a text: at most six characters are written for one
+
+  // Whether one of eight characters must be escaped: below a blank, a quotation mark or a backslash.
+  static bool anyEscaped(uint64_t word) {
+    constexpr uint64_t kOnes = 0x0101010101010101U;
+    constexpr uint64_t kHighs = 0x8080808080808080U;
+    const auto hasZero = [](uint64_t v) { return (v - kOnes) & ~v & kHighs; };
+    const uint64_t control = (word - kOnes * 0x20) & ~word & kHighs;
+    return (control | hasZero(word ^ kOnes * '"') | hasZero(word ^ kOnes * '\\')) != 0;
+  }
+
+  void appendEscaped(const char* from, const char* end) {
+    char* to = room(kPiece * 6);
+    while (from != end) {
+      for (uint64_t word; end - from >= 8; from += 8, to += 8) {
+        std::memcpy(&word, from, 8);
+        if (anyEscaped(word)) break;
+        std::memcpy(to, &word, 8);
+      }
+      // Eight at most one by one, then words again.
+      for (int i = 0; i < 8 && from != end; ++i) to = appendCharacter(to, *from++);
+    }
+    next_ = to;
+  }
+
+  static char* appendCharacter(char* to, char c) {
+    const auto code = static_cast<unsigned char>(c);
+    if (code >= 0x20 && c != '"' && c != '\\') [[likely]] {
+      *to = c;
+      return to + 1;
+    }
+    *to++ = '\\';
+    switch (c) {
+      case '"':
+      case '\\':
+        *to++ = c;
+        break;
+      case '\b':
+        *to++ = 'b';
+        break;
+      case '\f':
+        *to++ = 'f';
+        break;
+      case '\n':
+        *to++ = 'n';
+        break;
+      case '\r':
+        *to++ = 'r';
+        break;
+      case '\t':
+        *to++ = 't';
+        break;
+      default:
+        std::memcpy(to, "u00", 3);
+        to[3] = static_cast<char>('0' + (code >> 4));
+        to[4] = "0123456789ABCDEF"[code & 15];
+        to += 5;
+    }
+    return to;
+  }
+
+  std::string& out_;
+  char* next_ = buffer_;
+  char buffer_[kSize];
+};
+
+}  // namespace kyt

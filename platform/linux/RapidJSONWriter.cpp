@@ -1,0 +1,221 @@
+#include "platform/linux/RapidJSONWriter.h"
+
+#include <rapidjson/allocators.h>
+#include <rapidjson/encodedstream.h>
+#include <rapidjson/error/en.h>
+#include <rapidjson/memorystream.h>
+#include <rapidjson/prettywriter.h>
+#include <rapidjson/reader.h>
+#include <rapidjson/writer.h>
+
+#include <charconv>
+#include <cmath>
+#include <type_traits>
+#include <vector>
+
+#include "platform/Limits.h"
+#include "platform/linux/JSONTextStream.h"
+
+namespace kyt {
+namespace {
+
+// The writer's record of open containers lives on the stack up to this depth.
+constexpr size_t kLevels = 64;
+using LevelAllocator = rapidjson::MemoryPoolAllocator<>;
+using CompactBase = rapidjson::Writer<JSONTextStream, rapidjson::UTF8<>, rapidjson::UTF8<>, LevelAllocator>;
+using PrettyBase =
+    rapidjson::PrettyWriter<JSONTextStream, rapidjson::UTF8<>, rapidjson::UTF8<>, LevelAllocator>;
+
+// RapidJSON's writer for objects. Punctuation is its own; texts are copied by words, and doubles are the
+// shortest decimal in every case (RapidJSON's algorithm misses some).
+template <typename Base>
+class ObjectWriter : public Base {
+ public:
+  ObjectWriter(JSONTextStream& stream, LevelAllocator& allocator) : Base(stream, &allocator, kLevels) {}
+
+  void write(const Value& value) {
+    switch (value.kind()) {
+      case Value::Kind::string:
+        return text(value.string()->view());
+      case Value::Kind::integer:
+        return integer(*value.integer());
+      case Value::Kind::unsignedInteger:
+        return integer(*value.unsignedInteger());
+      case Value::Kind::boolean:
+        this->Bool(*value.boolean());
+        return;
+      case Value::Kind::real:
+        return real(*value.real());
+      case Value::Kind::dictionary:
+        return dictionary(*value.dictionary());
+      case Value::Kind::array:
+        return array(*value.array());
+      case Value::Kind::null:
+      case Value::Kind::date:
+      case Value::Kind::data:
+        this->Null();
+        return;
+    }
+  }
+
+ private:
+  void begin(rapidjson::Type type) {
+    if constexpr (std::is_same_v<Base, PrettyBase>) {
+      this->PrettyPrefix(type);
+    } else {
+      this->Prefix(type);
+    }
+  }
+
+  void text(std::string_view view) {
+    begin(rapidjson::kStringType);
+    this->os_->appendQuoted(view);
+    this->EndValue(true);
+  }
+
+  void integer(auto number) {
+    begin(rapidjson::kNumberType);
+    char* to = this->os_->room(24);
+    if constexpr (std::is_signed_v<decltype(number)>) {
+      this->os_->advance(rapidjson::internal::i64toa(number, to));
+    } else {
+      this->os_->advance(rapidjson::internal::u64toa(number, to));
+    }
+    this->EndValue(true);
+  }
+
+  void real(double number) {
+    if (!std::isfinite(number)) {
+      this->Null();
+      return;
+    }
+    begin(rapidjson::kNumberType);
+    // Without an exponent where people would write none, as decimalText() does.
+    const double magnitude = std::fabs(number);
+    const bool plain = magnitude == 0 || (magnitude >= 1e-6 && magnitude < 1e17);
+    char* to = this->os_->room(64);
+    const auto result = plain ? std::to_chars(to, to + 64, number, std::chars_format::fixed)
+                              : std::to_chars(to, to + 64, number);
+    this->os_->advance(result.ptr);
+    this->EndValue(true);
+  }
+
+  void dictionary(const Dictionary& entries) {
+    this->StartObject();
+    for (const DictionaryEntry& entry : entries) {
+      text(entry.key.view());
+      write(entry.value);
+    }
+    this->EndObject();
+  }
+
+  void array(const Array& elements) {
+    this->StartArray();
+    for (const Value& element : elements) write(element);
+    this->EndArray();
+  }
+};
+
+template <typename Base>
+void writeObject(const Value& value, std::string& out) {
+  alignas(std::max_align_t) char levels[kLevels * 16 + 128];
+  LevelAllocator allocator(levels, sizeof levels);
+  JSONTextStream stream(out);
+  ObjectWriter<Base> writer(stream, allocator);
+  writer.write(value);
+}
+
+// Builds objects from the reader's events. Answering false ends the parse.
+class Builder {
+ public:
+  using Ch = char;
+
+  bool Null() { return take(Value()); }
+  bool Bool(bool truth) { return take(Value(truth)); }
+  bool Int(int number) { return take(Value(int64_t{number})); }
+  bool Uint(unsigned number) { return take(Value(int64_t{number})); }
+  bool Int64(int64_t number) { return take(Value(number)); }
+  bool Uint64(uint64_t number) {
+    return take(number <= INT64_MAX ? Value(static_cast<int64_t>(number)) : Value(number));
+  }
+  bool Double(double number) { return take(Value(number)); }
+  bool RawNumber(const char*, rapidjson::SizeType, bool) { return false; }  // is not asked for
+  bool String(const char* text, rapidjson::SizeType length, bool) {
+    return take(Value(std::string_view(text, length)));
+  }
+  bool Key(const char* text, rapidjson::SizeType length, bool) {
+    open_.back().key = kyt::String(std::string_view(text, length));
+    return true;
+  }
+  bool StartObject() { return start(Value(Dictionary())); }
+  bool StartArray() { return start(Value(Array())); }
+  bool EndObject(rapidjson::SizeType) { return end(); }
+  bool EndArray(rapidjson::SizeType) { return end(); }
+
+  [[nodiscard]] bool tooDeep() const { return tooDeep_; }
+  [[nodiscard]] Value& root() { return root_; }
+
+ private:
+  struct Container {
+    Value value;
+    kyt::String key;  // the one that waits for its value
+  };
+
+  bool take(Value value) {
+    if (open_.empty()) {
+      root_ = std::move(value);
+    } else if (Array* array = open_.back().value.mutableArray()) {
+      array->append(std::move(value));
+    } else {
+      open_.back().value.mutableDictionary()->set(std::move(open_.back().key), std::move(value));
+    }
+    return true;
+  }
+  bool start(Value container) {
+    tooDeep_ = open_.size() >= static_cast<size_t>(Limits::maxObjectDepth);
+    if (!tooDeep_) open_.push_back({std::move(container), {}});
+    return !tooDeep_;
+  }
+  bool end() {
+    Value value = std::move(open_.back().value);
+    open_.pop_back();
+    return take(std::move(value));
+  }
+
+  std::vector<Container> open_;
+  Value root_;
+  bool tooDeep_ = false;
+};
+
+Error errorAt(size_t offset, int code, const char* what) {
+  return {kJSONErrorDomain, code, std::string(what) + " (offset " + std::to_string(offset) + ")"};
+}
+
+}  // namespace
+
+void RapidJSONWriter::writeCompact(const Value& value, std::string& out) {
+  writeObject<CompactBase>(value, out);
+}
+
+void RapidJSONWriter::writePretty(const Value& value, std::string& out) {
+  writeObject<PrettyBase>(value, out);
+}
+
+std::variant<Value, Error> RapidJSONWriter::parse(std::string_view text) {
+  // The reader takes a NUL for the end of the text, and would not look at what follows it.
+  if (const size_t zero = text.find('\0'); zero != text.npos)
+    return errorAt(zero, rapidjson::kParseErrorValueInvalid, "Invalid value.");
+  rapidjson::MemoryStream bytes(text.data(), text.size());
+  rapidjson::EncodedInputStream<rapidjson::UTF8<>, rapidjson::MemoryStream> stream(bytes);
+  rapidjson::Reader reader;
+  Builder builder;
+  const rapidjson::ParseResult result =
+      reader.Parse<rapidjson::kParseValidateEncodingFlag | rapidjson::kParseFullPrecisionFlag>(stream,
+                                                                                               builder);
+  if (builder.tooDeep()) return errorAt(result.Offset(), -1, "Containers are nested too deep.");
+  if (result.IsError())
+    return errorAt(result.Offset(), result.Code(), rapidjson::GetParseError_En(result.Code()));
+  return std::move(builder.root());
+}
+
+}  // namespace kyt

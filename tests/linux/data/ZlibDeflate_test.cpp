@@ -1,0 +1,125 @@
+#include "platform/linux/ZlibDeflate.h"
+
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "platform/fake/FaultyDeflate.h"
+
+namespace kyt {
+namespace {
+
+constexpr int kGzip = 15 + 16;
+
+std::string text() {
+  std::string result;
+  for (int i = 0; i < 500; ++i) result += "event " + std::to_string(i % 17) + ";";
+  return result;
+}
+
+std::string inflated(std::span<const std::byte> bytes) {
+  z_stream stream{};
+  EXPECT_EQ(inflateInit2(&stream, 15 + 32), Z_OK);
+  std::string result(100000, '\0');
+  stream.next_in = const_cast<Bytef*>(reinterpret_cast<const Bytef*>(bytes.data()));
+  stream.avail_in = static_cast<uInt>(bytes.size());
+  stream.next_out = reinterpret_cast<Bytef*>(result.data());
+  stream.avail_out = static_cast<uInt>(result.size());
+  EXPECT_EQ(inflate(&stream, Z_FINISH), Z_STREAM_END);
+  result.resize(stream.total_out);
+  inflateEnd(&stream);
+  return result;
+}
+
+TEST(ZlibDeflate, CompressesInOneCallIntoItsBound) {
+  ZlibDeflate deflate;
+  const auto stream = deflate.newStream();
+  ASSERT_EQ(stream->initialize(Z_DEFAULT_COMPRESSION, kGzip, 8), Z_OK);
+  const std::string source = text();
+  std::vector<std::byte> target(stream->bound(source.size()));
+  std::span<const std::byte> input = std::as_bytes(std::span(source));
+  std::span<std::byte> output(target);
+  EXPECT_EQ(stream->finish(input, output), Z_STREAM_END);
+  EXPECT_TRUE(input.empty());
+  target.resize(target.size() - output.size());
+  EXPECT_LT(target.size(), source.size() / 4);
+  EXPECT_EQ(target[0], std::byte{0x1F});
+  EXPECT_EQ(target[1], std::byte{0x8B});
+  EXPECT_EQ(inflated(target), source);
+  stream->end();
+  EXPECT_EQ(stream->message(), nullptr);
+}
+
+TEST(ZlibDeflate, GoesOnWhereTheOutputWasFull) {
+  ZlibDeflate deflate;
+  const auto stream = deflate.newStream();
+  ASSERT_EQ(stream->initialize(9, 15, 9), Z_OK);
+  const std::string source = text();
+  std::span<const std::byte> input = std::as_bytes(std::span(source));
+  std::vector<std::byte> target;
+  int result = Z_OK;
+  int calls = 0;
+  while (result == Z_OK && ++calls < 10000) {
+    std::byte piece[10];
+    std::span<std::byte> output(piece);
+    result = stream->finish(input, output);
+    target.insert(target.end(), piece, piece + (sizeof piece - output.size()));
+  }
+  EXPECT_EQ(result, Z_STREAM_END);
+  EXPECT_GT(calls, 2);
+  EXPECT_EQ(inflated(target), source);
+}
+
+TEST(ZlibDeflate, AnswersZlibsErrors) {
+  ZlibDeflate deflate;
+  const auto stream = deflate.newStream();
+  std::span<const std::byte> input;
+  std::span<std::byte> output;
+  EXPECT_EQ(stream->finish(input, output), Z_STREAM_ERROR);
+  EXPECT_EQ(stream->initialize(77, kGzip, 8), Z_STREAM_ERROR);
+  stream->end();
+  ASSERT_EQ(stream->initialize(6, kGzip, 8), Z_OK);
+  EXPECT_EQ(stream->finish(input, output), Z_STREAM_ERROR);  // there is no room at all
+}
+
+TEST(FaultyDeflate, FailsAsToldAndPassesOnTheRest) {
+  ZlibDeflate real;
+  FaultyDeflate deflate(&real);
+  deflate.faults.finish = {Z_BUF_ERROR};
+  deflate.faults.message = "told to fail";
+  const auto stream = deflate.newStream();
+  EXPECT_EQ(stream->initialize(6, kGzip, 8), Z_OK);
+  const std::string source = text();
+  std::vector<std::byte> target(stream->bound(source.size()));
+  std::span<const std::byte> input = std::as_bytes(std::span(source));
+  std::span<std::byte> output(target);
+  EXPECT_EQ(stream->finish(input, output), Z_BUF_ERROR);
+  EXPECT_EQ(input.size(), source.size());
+  EXPECT_STREQ(stream->message(), "told to fail");
+  EXPECT_EQ(stream->finish(input, output), Z_STREAM_END);
+  stream->end();
+  EXPECT_EQ(deflate.calls.windowBits, kGzip);
+  EXPECT_EQ(deflate.calls.finished, 2);
+  EXPECT_EQ(deflate.calls.ended, 1);
+  deflate.faults.initialize = Z_MEM_ERROR;
+  EXPECT_EQ(deflate.newStream()->initialize(6, kGzip, 8), Z_MEM_ERROR);
+}
+
+TEST(FaultyDeflate, CopiesWithoutARealOneBehindIt) {
+  FaultyDeflate deflate;
+  const auto stream = deflate.newStream();
+  EXPECT_EQ(stream->initialize(6, kGzip, 8), Z_OK);
+  std::byte source[3] = {std::byte{1}, std::byte{2}, std::byte{3}};
+  std::byte target[2] = {};
+  std::span<const std::byte> input(source);
+  std::span<std::byte> output(target);
+  EXPECT_EQ(stream->finish(input, output), Z_OK);
+  EXPECT_EQ(input.size(), 1U);
+  EXPECT_EQ(target[1], std::byte{2});
+}
+
+}  // namespace
+}  // namespace kyt
