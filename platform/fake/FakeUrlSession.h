@@ -26,9 +26,9 @@ class FakeURLSessionFactory final : public URLSessionFactory {
   // An answer: an error, or a status with headers and body.
   struct Reply {
     int status = 200;
-    Headers headers;
-    std::string body;
-    std::optional<Error> error;
+    Headers headers = {};
+    std::string body = {};
+    std::optional<Error> error = {};
   };
   // No value: the request stays open and the test answers it later.
   using Responder = std::function<std::optional<Reply>(const URLRequest&)>;

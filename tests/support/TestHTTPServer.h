@@ -47,8 +47,8 @@ class TestHTTPServer {
 
   struct Reply {
     int status = 200;
-    Headers headers;  // Content-Length is added unless Transfer-Encoding is among them
-    std::string body;
+    Headers headers = {};  // Content-Length is added unless Transfer-Encoding is among them
+    std::string body = {};
     Behaviour behaviour = Behaviour::answer;
     std::chrono::milliseconds interval{100};
     bool closeAfter = false;

@@ -1,0 +1,53 @@
+#include "platform/linux/url/CurlUrlSession.h"
+
+#include "platform/linux/url/UrlNetwork.h"
+
+namespace kyt {
+namespace {
+
+class CurlURLSession final : public URLSession {
+ public:
+  explicit CurlURLSession(std::shared_ptr<URLSessionState> state) : state_(std::move(state)) {}
+  ~CurlURLSession() override { CurlURLSession::finishTasksAndInvalidate(); }
+
+  std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) override {
+    auto transfer = std::make_shared<URLTransfer>(state_, std::move(request), std::move(completion));
+    transfer->refused = state_->invalidated.load();
+    state_->used = true;
+    state_->network->start(transfer);
+    return transfer;
+  }
+
+  void finishTasksAndInvalidate() override {
+    if (!state_->invalidated.exchange(true) && state_->used.load()) state_->network->invalidate(state_);
+  }
+
+ private:
+  std::shared_ptr<URLSessionState> state_;
+};
+
+}  // namespace
+
+CurlURLSessionFactory::CurlURLSessionFactory(CurlURLSessionOptions options, Log& log, Counters& counters)
+    : network_(std::make_shared<URLNetwork>(std::move(options), log, counters)) {}
+
+CurlURLSessionFactory::~CurlURLSessionFactory() {
+  network_->stop();
+}
+
+std::unique_ptr<URLSession> CurlURLSessionFactory::create(URLSessionConfiguration configuration) {
+  return std::make_unique<CurlURLSession>(
+      std::make_shared<URLSessionState>(network_, std::move(configuration)));
+}
+
+void CurlURLSessionFactory::cancelAll() {
+  network_->cancelAll();
+}
+URLFigures CurlURLSessionFactory::figures() const {
+  return network_->figures();
+}
+size_t CurlURLSessionFactory::outstanding() const {
+  return network_->outstanding();
+}
+
+}  // namespace kyt

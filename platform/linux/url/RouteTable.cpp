@@ -1,0 +1,177 @@
+#include "platform/linux/url/RouteTable.h"
+
+#include <arpa/inet.h>
+#include <fnmatch.h>
+#include <linux/netlink.h>
+#include <linux/rtnetlink.h>
+#include <net/if.h>
+#include <netinet/in.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <fstream>
+#include <memory>
+
+namespace kyt {
+namespace {
+
+struct RouteQuestion {
+  nlmsghdr header;
+  rtmsg route;
+  char attributes[64];
+
+  void add(unsigned short type, const void* bytes, size_t size) {
+    auto* attribute =
+        reinterpret_cast<rtattr*>(reinterpret_cast<char*>(this) + NLMSG_ALIGN(header.nlmsg_len));
+    attribute->rta_type = type;
+    attribute->rta_len = static_cast<unsigned short>(RTA_LENGTH(size));
+    std::memcpy(RTA_DATA(attribute), bytes, size);
+    header.nlmsg_len = static_cast<unsigned>(NLMSG_ALIGN(header.nlmsg_len) + RTA_ALIGN(attribute->rta_len));
+  }
+};
+
+// The answer's interface when the route is one that carries packets.
+std::optional<int> usableInterface(const nlmsghdr* header) {
+  if (header->nlmsg_type != RTM_NEWROUTE) return std::nullopt;  // an error: no route
+  const auto* route = static_cast<const rtmsg*>(NLMSG_DATA(header));
+  const bool carries = route->rtm_type == RTN_UNICAST || route->rtm_type == RTN_LOCAL ||
+                       route->rtm_type == RTN_ANYCAST || route->rtm_type == RTN_BROADCAST ||
+                       route->rtm_type == RTN_MULTICAST;
+  if (!carries || (route->rtm_flags & (RTNH_F_DEAD | RTNH_F_LINKDOWN)) != 0) return std::nullopt;
+  int interface = 0;
+  auto left = static_cast<unsigned>(RTM_PAYLOAD(header));
+  for (const rtattr* attribute = RTM_RTA(route); RTA_OK(attribute, left);
+       attribute = RTA_NEXT(attribute, left)) {
+    if (attribute->rta_type == RTA_OIF) std::memcpy(&interface, RTA_DATA(attribute), sizeof interface);
+  }
+  return interface;
+}
+
+std::string nameOf(int interface) {
+  char name[IF_NAMESIZE] = {};
+  return interface != 0 && if_indextoname(static_cast<unsigned>(interface), name) != nullptr ? name : "";
+}
+
+sockaddr_storage parseAddress(int family, const char* text) {
+  sockaddr_storage storage{};
+  storage.ss_family = static_cast<sa_family_t>(family);
+  void* place = family == AF_INET ? static_cast<void*>(&reinterpret_cast<sockaddr_in&>(storage).sin_addr)
+                                  : &reinterpret_cast<sockaddr_in6&>(storage).sin6_addr;
+  if (inet_pton(family, text, place) != 1) storage.ss_family = AF_UNSPEC;
+  return storage;
+}
+
+const sockaddr& generic(const sockaddr_storage& storage) {
+  return reinterpret_cast<const sockaddr&>(storage);
+}
+
+}  // namespace
+
+RouteTable::RouteTable(std::vector<std::string> cellularInterfaces, std::string sysClassNet,
+                       std::string resolverFile)
+    : cellularInterfaces_(std::move(cellularInterfaces)),
+      sysClassNet_(std::move(sysClassNet)),
+      resolverFile_(std::move(resolverFile)) {}
+
+RouteTable::~RouteTable() {
+  if (socket_ >= 0) close(socket_);
+}
+
+std::optional<int> RouteTable::lookUp(const sockaddr& address, int through) {
+  if (address.sa_family != AF_INET && address.sa_family != AF_INET6) return 0;
+  if (socket_ < 0) socket_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE);
+  if (socket_ < 0) return 0;
+
+  RouteQuestion question{};
+  question.header.nlmsg_len = NLMSG_LENGTH(sizeof(rtmsg));
+  question.header.nlmsg_type = RTM_GETROUTE;
+  question.header.nlmsg_flags = NLM_F_REQUEST;
+  question.header.nlmsg_seq = ++sequence_;
+  question.route.rtm_family = static_cast<unsigned char>(address.sa_family);
+  if (address.sa_family == AF_INET) {
+    question.route.rtm_dst_len = 32;
+    question.add(RTA_DST, &reinterpret_cast<const sockaddr_in&>(address).sin_addr, 4);
+  } else {
+    const auto& six = reinterpret_cast<const sockaddr_in6&>(address);
+    question.route.rtm_dst_len = 128;
+    question.add(RTA_DST, &six.sin6_addr, 16);
+    if (through == 0) through = static_cast<int>(six.sin6_scope_id);
+  }
+  if (through != 0) {
+    // Asked for an interface without a route to the address, IPv4 takes the address for a neighbour there.
+    // Only an entry of the table counts.
+    question.route.rtm_flags = RTM_F_FIB_MATCH;
+    question.add(RTA_OIF, &through, sizeof through);
+  }
+  if (send(socket_, &question, question.header.nlmsg_len, 0) < 0) return 0;
+
+  alignas(nlmsghdr) char answer[4096];
+  for (;;) {
+    const ssize_t size = recv(socket_, answer, sizeof answer, 0);
+    if (size < 0) {
+      if (errno == EINTR) continue;
+      return 0;
+    }
+    const auto* header = reinterpret_cast<const nlmsghdr*>(answer);
+    if (NLMSG_OK(header, static_cast<unsigned>(size)) && header->nlmsg_seq == sequence_)
+      return usableInterface(header);
+  }
+}
+
+bool RouteTable::isReachable(const sockaddr& address, bool avoidCellular) {
+  if (avoidCellular) return interfaceAvoidingCellular(address).has_value();
+  return lookUp(address, 0).has_value();
+}
+
+std::optional<std::string> RouteTable::interfaceAvoidingCellular(const sockaddr& address) {
+  const std::optional<int> preferred = lookUp(address, 0);
+  if (!preferred) return std::nullopt;
+  std::string name = nameOf(*preferred);
+  if (!isCellular(name)) return name;
+  const std::unique_ptr<struct if_nameindex, decltype(&if_freenameindex)> all(if_nameindex(),
+                                                                              if_freenameindex);
+  if (!all) return std::nullopt;
+  for (const struct if_nameindex* one = all.get(); one->if_index != 0; ++one) {
+    if (isCellular(one->if_name)) continue;
+    const auto index = static_cast<int>(one->if_index);
+    if (lookUp(address, index).has_value()) return one->if_name;
+  }
+  return std::nullopt;
+}
+
+bool RouteTable::isCellular(const std::string& interface) const {
+  if (interface.empty()) return false;
+  for (const std::string& pattern : cellularInterfaces_)
+    if (fnmatch(pattern.c_str(), interface.c_str(), 0) == 0) return true;
+  std::ifstream description(sysClassNet_ + "/" + interface + "/uevent");
+  for (std::string line; std::getline(description, line);)
+    if (line == "DEVTYPE=wwan") return true;
+  return false;
+}
+
+bool RouteTable::hasDefaultRoute() {
+  // Addresses that no network uses, so that only a default route leads to them.
+  return lookUp(generic(parseAddress(AF_INET, "192.0.2.1")), 0).has_value() ||
+         lookUp(generic(parseAddress(AF_INET6, "2001:db8::1")), 0).has_value();
+}
+
+bool RouteTable::canResolve() {
+  bool named = false;
+  std::ifstream file(resolverFile_);
+  for (std::string line; std::getline(file, line);) {
+    if (!line.starts_with("nameserver")) continue;
+    const size_t first = line.find_first_not_of(" \t", 10);
+    if (first == std::string::npos) continue;
+    const std::string text = line.substr(first, line.find_first_of(" \t%#;", first) - first);
+    sockaddr_storage address = parseAddress(AF_INET, text.c_str());
+    if (address.ss_family == AF_UNSPEC) address = parseAddress(AF_INET6, text.c_str());
+    if (address.ss_family == AF_UNSPEC) continue;
+    named = true;
+    const bool local = text.starts_with("127.") || text == "::1";
+    if (local ? hasDefaultRoute() : lookUp(generic(address), 0).has_value()) return true;
+  }
+  return !named && hasDefaultRoute();
+}
+
+}  // namespace kyt

@@ -1,0 +1,169 @@
+#include "platform/linux/url/UrlConnectionPool.h"
+
+#include <openssl/ssl.h>
+#include <sys/epoll.h>
+
+#include "platform/Limits.h"
+#include "platform/linux/url/UrlNetwork.h"
+#include "platform/linux/url/UrlSessionState.h"
+
+namespace kyt {
+namespace {
+
+constexpr long kConnectionsPerServer = 8;
+constexpr size_t kKeptHandles = 2;  // each keeps its buffers
+
+CURLcode useCertificates(CURL*, void* context, void* network) {
+  CertificateStore& store = static_cast<URLNetwork*>(network)->certificates();
+  return store.install(static_cast<SSL_CTX*>(context)) ? CURLE_OK : CURLE_SSL_CACERT_BADFILE;
+}
+
+}  // namespace
+
+URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& session, size_t number)
+    : network_(network),
+      session_(session),
+      number_(number),
+      multi_(curl_multi_init()),
+      timer_(
+          network.deadlines(), [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); },
+          this),
+      idle_(
+          network.deadlines(),
+          [](void* pool) {
+            auto* idle = static_cast<URLConnectionPool*>(pool);
+            idle->network_.closePool(idle->session_, idle->number_);
+          },
+          this) {
+  if (multi_ == nullptr) return;
+  curl_multi_setopt(multi_, CURLMOPT_SOCKETFUNCTION, socketChanged);
+  curl_multi_setopt(multi_, CURLMOPT_SOCKETDATA, this);
+  curl_multi_setopt(multi_, CURLMOPT_TIMERFUNCTION, timerChanged);
+  curl_multi_setopt(multi_, CURLMOPT_TIMERDATA, this);
+  curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
+  curl_multi_setopt(multi_, CURLMOPT_MAXCONNECTS, kConnectionsPerServer);
+}
+
+URLConnectionPool::~URLConnectionPool() {
+  for (CURL* handle : idleHandles_) curl_easy_cleanup(handle);
+  if (multi_ != nullptr) curl_multi_cleanup(multi_);
+}
+
+CURL* URLConnectionPool::takeHandle() {
+  if (!idleHandles_.empty()) {
+    CURL* handle = idleHandles_.back();
+    idleHandles_.pop_back();
+    return handle;
+  }
+  CURL* handle = curl_easy_init();
+  if (handle == nullptr) return nullptr;
+  const auto milliseconds = [](Duration duration) {
+    return static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(duration).count());
+  };
+  const auto seconds = [](Duration duration) {
+    return static_cast<long>(std::chrono::ceil<std::chrono::seconds>(duration).count());
+  };
+  const CurlURLSessionOptions& options = network_.options();
+  curl_easy_setopt(handle, CURLOPT_NOSIGNAL, 1L);
+  curl_easy_setopt(handle, CURLOPT_NOPROGRESS, 0L);
+  curl_easy_setopt(handle, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl_easy_setopt(handle, CURLOPT_REDIR_PROTOCOLS_STR, "https");
+  curl_easy_setopt(handle, CURLOPT_PROXY, "");  // nor one from the environment
+  curl_easy_setopt(handle, CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
+  curl_easy_setopt(handle, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+  curl_easy_setopt(handle, CURLOPT_PIPEWAIT, 1L);  // a burst shares one HTTP/2 connection
+  curl_easy_setopt(handle, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
+  curl_easy_setopt(handle, CURLOPT_SSL_VERIFYPEER, 1L);
+  curl_easy_setopt(handle, CURLOPT_SSL_VERIFYHOST, 2L);
+  curl_easy_setopt(handle, CURLOPT_CAINFO, nullptr);  // the store below instead
+  curl_easy_setopt(handle, CURLOPT_CAPATH, nullptr);
+  curl_easy_setopt(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
+  curl_easy_setopt(handle, CURLOPT_SSL_CTX_DATA, &network_);
+  curl_easy_setopt(handle, CURLOPT_TCP_NODELAY, 1L);
+  curl_easy_setopt(handle, CURLOPT_CONNECTTIMEOUT_MS,
+                   std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
+  curl_easy_setopt(handle, CURLOPT_MAXAGE_CONN, seconds(options.idleConnectionTime));
+  curl_easy_setopt(handle, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(Limits::maxHTTPReplyBytes));
+  curl_easy_setopt(handle, CURLOPT_CLOSESOCKETFUNCTION, URLNetwork::socketClosed);
+  curl_easy_setopt(handle, CURLOPT_CLOSESOCKETDATA, &network_);
+  curl_easy_setopt(handle, CURLOPT_QUICK_EXIT, 1L);  // giving up a look-up of a name must not wait for it
+  return handle;
+}
+
+CURLcode URLConnectionPool::add(URLTransfer& transfer) {
+  CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
+  if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
+  transfer.configure(handle);
+  if (curl_multi_add_handle(multi_, handle) != CURLM_OK) {
+    curl_easy_cleanup(handle);
+    return CURLE_FAILED_INIT;
+  }
+  transfer.handle = handle;
+  ++active_;
+  idle_.cancel();
+  return CURLE_OK;
+}
+
+void URLConnectionPool::remove(URLTransfer& transfer) {
+  CURL* handle = std::exchange(transfer.handle, nullptr);
+  curl_multi_remove_handle(multi_, handle);
+  if (idleHandles_.size() < kKeptHandles) {
+    curl_easy_setopt(handle, CURLOPT_ERRORBUFFER, nullptr);
+    curl_easy_setopt(handle, CURLOPT_HTTPHEADER, nullptr);
+    idleHandles_.push_back(handle);
+  } else {
+    curl_easy_cleanup(handle);
+  }
+  --active_;
+  closeIfIdle();
+}
+
+void URLConnectionPool::closeIfIdle() {
+  if (active_ != 0) return;
+  const bool now = session_.invalidated.load();
+  idle_.set(now ? network_.now() : network_.now() + network_.options().idleConnectionTime);
+}
+
+int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  self.network_.watchSocket(self, socket, what);
+  return 0;
+}
+
+int URLConnectionPool::timerChanged(CURLM*, long milliseconds, void* pool) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  if (milliseconds < 0) {
+    self.timer_.cancel();
+  } else {
+    self.timer_.set(self.network_.now() + std::chrono::milliseconds(milliseconds));
+  }
+  return 0;
+}
+
+void URLConnectionPool::timerExpired() {
+  int running = 0;
+  curl_multi_socket_action(multi_, CURL_SOCKET_TIMEOUT, 0, &running);
+  finishEnded();
+}
+
+void URLConnectionPool::socketReady(int socket, uint32_t events) {
+  int mask = 0, running = 0;
+  if ((events & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
+  if ((events & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
+  if ((events & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
+  curl_multi_socket_action(multi_, socket, mask, &running);
+  finishEnded();
+}
+
+void URLConnectionPool::finishEnded() {
+  int left = 0;
+  while (const CURLMsg* message = curl_multi_info_read(multi_, &left)) {
+    if (message->msg != CURLMSG_DONE) continue;
+    URLTransfer* transfer = nullptr;
+    const CURLcode code = message->data.result;
+    curl_easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &transfer);
+    network_.transferEnded(*transfer, code);
+  }
+}
+
+}  // namespace kyt

@@ -1,0 +1,368 @@
+#include "platform/linux/url/UrlNetwork.h"
+
+#include <pthread.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <system_error>
+
+namespace kyt {
+namespace {
+
+constexpr uint64_t kWake = ~uint64_t{0};
+constexpr uint64_t kRoutes = kWake - 1;  // as in UrlNetworkWaiting.cpp
+constexpr Duration kStopPatience = std::chrono::seconds(5);
+
+MonotonicTime currentTime() {
+  return std::chrono::steady_clock::now();
+}
+
+void nameThread(const char* name) {
+  pthread_setname_np(pthread_self(), name);
+}
+
+WorkerPoolOptions completionWorkers() {
+  WorkerPoolOptions options;
+  options.runnable = 2;
+  options.maxWorkers = 4;
+  options.name = "kyt-url";
+  options.nameThread = nameThread;
+  return options;
+}
+
+}  // namespace
+
+URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counters)
+    : options_(std::move(options)),
+      log_(log),
+      counters_(counters),
+      routes_(options_.cellularInterfaces, options_.sysClassNet, options_.resolverFile),
+      certificates_(options_.certificateFile),
+      settle_(
+          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->retryWaiting(false); }, this),
+      slowRetry_(
+          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->waitingTimer(); }, this) {}
+
+URLNetwork::~URLNetwork() {
+  if (epoll_ >= 0) close(epoll_);
+  if (wake_ >= 0) close(wake_);
+}
+
+void URLNetwork::start(std::shared_ptr<URLTransfer> transfer) {
+  started_.fetch_add(1, std::memory_order_relaxed);
+  outstanding_.fetch_add(1);
+  submit({Kind::start, std::move(transfer), nullptr});
+}
+
+void URLNetwork::cancel(std::shared_ptr<URLTransfer> transfer) {
+  submit({Kind::cancel, std::move(transfer), nullptr});
+}
+
+void URLNetwork::invalidate(std::shared_ptr<URLSessionState> session) {
+  submit({Kind::invalidate, nullptr, std::move(session)});
+}
+
+void URLNetwork::cancelAll() {
+  cancelled_ = true;
+  MutexLock lock(mutex_);
+  if (running_) eventfd_write(wake_, 1);
+}
+
+void URLNetwork::submit(Command command) {
+  MutexLock lock(mutex_);
+  if (stopping_) return;
+  commands_.push_back(std::move(command));
+  if (running_) {
+    if (commands_.size() == 1) eventfd_write(wake_, 1);
+    return;
+  }
+  if (epoll_ < 0) epoll_ = epoll_create1(EPOLL_CLOEXEC);
+  if (wake_ < 0) wake_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  // The thread takes no signals: they are the main thread's business.
+  sigset_t all, before;
+  sigfillset(&all);
+  pthread_sigmask(SIG_SETMASK, &all, &before);
+  try {
+    thread_ = std::thread([this] { run(); });
+    running_ = true;
+  } catch (const std::system_error& error) {  // the next command tries again
+    log_.error("CurlURLSession(start): cannot start the network thread: %s", error.what());
+  }
+  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+}
+
+void URLNetwork::stop() {
+  std::thread thread;
+  cancelAll();
+  {
+    MutexLock lock(mutex_);
+    stopping_ = true;
+    thread = std::move(thread_);
+    if (running_) eventfd_write(wake_, 1);
+  }
+  if (!thread.joinable()) return;
+  thread.join();
+  {
+    std::unique_lock lock(mutex_.native());
+    (void)allDelivered_.wait_for(lock, kStopPatience, [&] { return outstanding_.load() == 0; });
+  }
+  if (workers_) workers_->shutDown();
+}
+
+void URLNetwork::completionHasRun() {
+  if (outstanding_.fetch_sub(1) != 1) return;
+  MutexLock lock(mutex_);
+  allDelivered_.notify_all();
+}
+
+URLFigures URLNetwork::figures() const {
+  URLFigures figures;
+  figures.started = started_.load();
+  figures.completed = completed_.load();
+  figures.failed = failed_.load();
+  figures.waiting = waiting_.load();
+  figures.waitingBytes = waitingBodyBytes_.load();
+  figures.droppedWhileWaiting = displaced_.load();
+  return figures;
+}
+
+void URLNetwork::run() {
+  nameThread("kyt-network");
+  curl_global_init(CURL_GLOBAL_DEFAULT);
+  workers_ = std::make_unique<WorkerPool>(completionWorkers());
+  epoll_event wake{};
+  wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read
+  wake.data.u64 = kWake;
+  epoll_ctl(epoll_, EPOLL_CTL_ADD, wake_, &wake);
+  now_ = currentTime();
+  for (;;) {
+    takeCommands();
+    deadlines_.fireUntil(now_);
+    if (cancelled_.load()) {
+      cancelEverything();
+      MutexLock lock(mutex_);
+      if (stopping_ && commands_.empty()) break;
+    }
+    epoll_event events[64];
+    const int count = epoll_wait(epoll_, events, 64, deadlines_.millisecondsFrom(now_));
+    now_ = currentTime();
+    for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);
+  }
+  while (!sessions_.empty()) {
+    const std::shared_ptr<URLSessionState> session = sessions_.first()->self;
+    closePool(*session, 0);
+    closePool(*session, 1);
+  }
+  curl_global_cleanup();
+}
+
+void URLNetwork::handleEvent(uint64_t which, uint32_t events) {
+  if (which == kWake) return;  // commands are taken after every wait
+  if (which == kRoutes) {
+    routesChanged();
+    return;
+  }
+  Watched& watched = sockets_[which];
+  if (watched.pool != nullptr) {
+    watched.pool->socketReady(static_cast<int>(which), events);
+  } else if (watched.events != 0) {
+    // An idle connection that was left watched in the hope of its next request: the server closed it. libcurl
+    // finds that out when it looks at the connection again.
+    epoll_ctl(epoll_, EPOLL_CTL_DEL, static_cast<int>(which), nullptr);
+    watched.events = 0;
+  }
+}
+
+void URLNetwork::takeCommands() {
+  {
+    MutexLock lock(mutex_);
+    if (commands_.empty()) return;
+    taken_.swap(commands_);
+  }
+  for (Command& command : taken_) {
+    switch (command.kind) {
+      case Kind::start:
+        begin(std::move(command.transfer));
+        break;
+      case Kind::cancel:
+        if (command.transfer->phase != URLTransfer::Phase::done)
+          fail(*command.transfer, kURLErrorCancelled, "The request was cancelled");
+        break;
+      case Kind::invalidate:
+        for (const auto& pool : command.session->pools)
+          if (pool) pool->closeIfIdle();
+        break;
+    }
+  }
+  taken_.clear();
+}
+
+void URLNetwork::begin(std::shared_ptr<URLTransfer> transfer) {
+  URLTransfer& begun = *transfer;
+  URLSessionState& session = *begun.session;
+  begun.self = std::move(transfer);
+  session.transfers.append(begun);
+  if (!session.self) {
+    session.self = begun.session;
+    sessions_.append(session);
+  }
+  begun.started = now_;
+  if (begun.refused || cancelled_.load()) {
+    fail(begun, kURLErrorCancelled, "The URL session was invalidated");
+  } else {
+    activate(begun);
+  }
+}
+
+void URLNetwork::activate(URLTransfer& transfer) {
+  std::unique_ptr<URLConnectionPool>& pool =
+      transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1];
+  if (!pool)
+    pool = std::make_unique<URLConnectionPool>(*this, *transfer.session, &pool - transfer.session->pools);
+  transfer.clearReply();
+  transfer.lastProgress = now_;
+  const CURLcode code = pool->add(transfer);
+  if (code != CURLE_OK) {
+    fail(transfer, code, curl_easy_strerror(code));
+    return;
+  }
+  transfer.phase = URLTransfer::Phase::active;
+  armDeadline(transfer);
+}
+
+void URLNetwork::armDeadline(URLTransfer& transfer) {
+  const bool active = transfer.phase == URLTransfer::Phase::active;
+  MonotonicTime soonest = active ? transfer.lastProgress + options_.noProgressTimeout : MonotonicTime::max();
+  if (transfer.request.timeout) soonest = std::min(soonest, transfer.started + *transfer.request.timeout);
+  if (soonest == MonotonicTime::max()) {
+    transfer.deadline.cancel();
+  } else {
+    transfer.deadline.set(soonest);
+  }
+}
+
+void URLNetwork::transferDeadline(URLTransfer& transfer) {
+  const bool late = transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout;
+  const bool stuck = transfer.phase == URLTransfer::Phase::active &&
+                     now_ >= transfer.lastProgress + options_.noProgressTimeout;
+  if (late || stuck) {
+    fail(transfer, CURLE_OPERATION_TIMEDOUT, late ? "The request timed out" : "The request made no progress");
+  } else {
+    armDeadline(transfer);
+  }
+}
+
+void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
+  long status = 0, systemError = 0;
+  curl_easy_getinfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
+  curl_easy_getinfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
+  if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
+  withdraw(transfer);
+  if (code == CURLE_OK) {
+    transfer.takeReply(static_cast<int>(status));
+    completed_.fetch_add(1, std::memory_order_relaxed);
+    finish(transfer);
+    return;
+  }
+  if (retryOrWait(transfer, code, systemError)) return;
+  if (transfer.onlyCellularRoutes) {
+    fail(transfer, code, "The request may not use cellular interfaces, and no other leads to the server");
+  } else {
+    fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_easy_strerror(code));
+  }
+}
+
+void URLNetwork::withdraw(URLTransfer& transfer) {
+  if (transfer.handle != nullptr)
+    transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1]->remove(transfer);
+  if (transfer.phase == URLTransfer::Phase::waiting) stopWaiting(transfer);
+  transfer.deadline.cancel();
+  transfer.phase = URLTransfer::Phase::submitted;
+}
+
+void URLNetwork::fail(URLTransfer& transfer, int32_t code, std::string description) {
+  transfer.takeError(code, std::move(description));
+  withdraw(transfer);
+  failed_.fetch_add(1, std::memory_order_relaxed);
+  finish(transfer);
+}
+
+void URLNetwork::finish(URLTransfer& transfer) {
+  URLSessionState& session = *transfer.session;
+  transfer.phase = URLTransfer::Phase::done;
+  session.transfers.remove(transfer);
+  if (!session.queue) session.queue = SerialQueue::create("URL session", *workers_);
+  const std::shared_ptr<SerialQueue> queue = session.queue;
+  const std::shared_ptr<URLTransfer> delivered = std::move(transfer.self);
+  unlistIfUnused(session);
+  queue->async([delivered] { delivered->deliver(); });
+}
+
+void URLNetwork::cancelEverything() {
+  for (URLSessionState* session = sessions_.first(); session != nullptr;) {
+    URLSessionState* next = session->links.next;
+    std::shared_ptr<URLSessionState> kept;  // while its last request goes
+    while (URLTransfer* transfer = session->transfers.first()) {
+      kept = transfer->session;
+      fail(*transfer, kURLErrorCancelled, "The request was cancelled");
+    }
+    session = next;
+  }
+}
+
+void URLNetwork::closePool(URLSessionState& session, size_t number) {
+  session.pools[number].reset();
+  unlistIfUnused(session);
+}
+
+void URLNetwork::unlistIfUnused(URLSessionState& session) {
+  if (!session.self || !session.transfers.empty() || session.pools[0] || session.pools[1]) return;
+  sessions_.remove(session);
+  const std::shared_ptr<URLSessionState> last = std::move(session.self);
+}
+
+void URLNetwork::socketOpened(int socket) {
+  if (sockets_.size() <= static_cast<size_t>(socket)) sockets_.resize(static_cast<size_t>(socket) + 1);
+  sockets_[static_cast<size_t>(socket)] = {nullptr, 0, true};
+}
+
+int URLNetwork::socketClosed(void* network, curl_socket_t socket) {
+  auto& self = *static_cast<URLNetwork*>(network);
+  if (static_cast<size_t>(socket) < self.sockets_.size()) self.sockets_[static_cast<size_t>(socket)] = {};
+  return close(socket);
+}
+
+void URLNetwork::watchSocket(URLConnectionPool& pool, int socket, int what) {
+  const auto index = static_cast<size_t>(socket);
+  if (sockets_.size() <= index) sockets_.resize(index + 1);
+  Watched& watched = sockets_[index];
+  if (what == CURL_POLL_REMOVE) {
+    watched.pool = nullptr;
+    // A connection that only waits to be used again stays watched for input, which is what its next request
+    // starts with: two system calls fewer for each request.
+    if (watched.ours && watched.events == EPOLLIN) return;
+    if (watched.events != 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
+    watched.events = 0;
+    return;
+  }
+  const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
+                          ((what & CURL_POLL_OUT) != 0 ? uint32_t{EPOLLOUT} : 0);
+  watched.pool = &pool;
+  if (watched.events == wanted) return;
+  epoll_event event{};
+  event.events = wanted;
+  event.data.u64 = index;
+  const int operation = watched.events == 0 ? EPOLL_CTL_ADD : EPOLL_CTL_MOD;
+  if (epoll_ctl(epoll_, operation, socket, &event) != 0) {
+    // A number that the resolver used again without telling: the kernel knows better.
+    const int other = errno == EEXIST ? EPOLL_CTL_MOD : EPOLL_CTL_ADD;
+    if (epoll_ctl(epoll_, other, socket, &event) != 0) return;
+  }
+  watched.events = wanted;
+}
+
+}  // namespace kyt

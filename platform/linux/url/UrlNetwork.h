@@ -1,0 +1,131 @@
+// The network thread ("kyt-network") and everything it runs: the event loop over the sockets of all
+// connection pools, time-outs, requests that wait for connectivity, and the hand-over of results to the
+// sessions' delegate queues.
+//
+// Other threads submit commands, with a short lock and one wake-up for each burst. The thread is started by
+// the first command and ended by stop(). Held by the factory and by every session, so that a session may
+// outlive the factory.
+#pragma once
+
+#include <atomic>
+#include <condition_variable>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "platform/Counters.h"
+#include "platform/Log.h"
+#include "platform/Mutex.h"
+#include "platform/WorkerPool.h"
+#include "platform/linux/url/CertificateStore.h"
+#include "platform/linux/url/CurlUrlSession.h"
+#include "platform/linux/url/DeadlineHeap.h"
+#include "platform/linux/url/RouteEvents.h"
+#include "platform/linux/url/RouteTable.h"
+#include "platform/linux/url/UrlSessionState.h"
+
+namespace kyt {
+
+class URLNetwork {
+ public:
+  URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counters);
+  ~URLNetwork();
+  URLNetwork(const URLNetwork&) = delete;
+  URLNetwork& operator=(const URLNetwork&) = delete;
+
+  // Any thread.
+  void start(std::shared_ptr<URLTransfer> transfer);
+  void cancel(std::shared_ptr<URLTransfer> transfer);
+  void invalidate(std::shared_ptr<URLSessionState> session);
+  void cancelAll();
+  void stop();  // once, not from a thread of this network
+  void completionHasRun();
+  [[nodiscard]] URLFigures figures() const;
+  [[nodiscard]] size_t outstanding() const { return outstanding_.load(); }
+
+  // The network thread's, for pools and transfers.
+  [[nodiscard]] MonotonicTime now() const { return now_; }
+  [[nodiscard]] DeadlineHeap& deadlines() { return deadlines_; }
+  [[nodiscard]] RouteTable& routes() { return routes_; }
+  [[nodiscard]] CertificateStore& certificates() { return certificates_; }
+  [[nodiscard]] const CurlURLSessionOptions& options() const { return options_; }
+  void socketOpened(int socket);
+  static int socketClosed(void* network, curl_socket_t socket);
+  void watchSocket(URLConnectionPool& pool, int socket, int what);
+  void transferEnded(URLTransfer& transfer, CURLcode code);
+  void transferDeadline(URLTransfer& transfer);
+  void closePool(URLSessionState& session, size_t number);
+
+ private:
+  enum class Kind : uint8_t { start, cancel, invalidate };
+  struct Command {
+    Kind kind;
+    std::shared_ptr<URLTransfer> transfer;
+    std::shared_ptr<URLSessionState> session;
+  };
+  // What the event loop knows about a socket, by number.
+  struct Watched {
+    URLConnectionPool* pool = nullptr;  // null: not libcurl's any more, or not at the moment
+    uint32_t events = 0;                // that the kernel watches; 0: none
+    bool ours = false;                  // opened by openSocket(), so that its end is told
+  };
+
+  void submit(Command command);
+  void run();
+  void handleEvent(uint64_t which, uint32_t events);
+  void takeCommands();
+  void begin(std::shared_ptr<URLTransfer> transfer);
+  void activate(URLTransfer& transfer);
+  void armDeadline(URLTransfer& transfer);
+  void withdraw(URLTransfer& transfer);  // from its pool, or from those that wait
+  void finish(URLTransfer& transfer);    // its result is set
+  void fail(URLTransfer& transfer, int32_t code, std::string description);
+  void unlistIfUnused(URLSessionState& session);
+  void cancelEverything();
+
+  // Waiting for connectivity (UrlNetworkWaiting.cpp).
+  [[nodiscard]] bool retryOrWait(URLTransfer& transfer, CURLcode code, long systemError);
+  [[nodiscard]] bool canLeave(URLTransfer& transfer);
+  void setAside(URLTransfer& transfer);
+  void displaceOldest(URLSessionState& session);
+  void stopWaiting(URLTransfer& transfer);
+  void listenForRoutes();
+  void routesChanged();
+  void retryWaiting(bool all);
+  void waitingTimer();
+
+  // Constant.
+  const CurlURLSessionOptions options_;
+  Log& log_;
+  Counters& counters_;
+
+  // Self-synchronised.
+  std::atomic<size_t> outstanding_{0};
+  std::atomic<bool> cancelled_{false};
+  std::atomic<uint64_t> started_{0}, completed_{0}, failed_{0}, waiting_{0}, waitingBodyBytes_{0},
+      displaced_{0};
+  int epoll_ = -1, wake_ = -1;
+
+  Mutex mutex_;
+  std::vector<Command> commands_ GUARDED_BY(mutex_);
+  bool running_ GUARDED_BY(mutex_) = false;
+  bool stopping_ GUARDED_BY(mutex_) = false;
+  std::thread thread_ GUARDED_BY(mutex_);
+  std::condition_variable allDelivered_;
+
+  // The network thread's.
+  MonotonicTime now_;
+  DeadlineHeap deadlines_;
+  RouteTable routes_;
+  RouteEvents routeEvents_;
+  CertificateStore certificates_;
+  std::vector<Watched> sockets_;
+  std::vector<Command> taken_;
+  LinkedList<URLSessionState> sessions_;  // that have requests or connections
+  Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
+  Deadline slowRetry_;
+
+  std::unique_ptr<WorkerPool> workers_;  // made by the network thread, shut down by stop()
+};
+
+}  // namespace kyt

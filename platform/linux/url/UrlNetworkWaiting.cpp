@@ -1,0 +1,131 @@
+// The network thread's requests that wait for connectivity: which failures count as being offline, what wakes
+// a request, and what gives way when too much waits.
+#include <sys/epoll.h>
+
+#include <algorithm>
+#include <cerrno>
+
+#include "platform/Limits.h"
+#include "platform/linux/url/UrlNetwork.h"
+
+namespace kyt {
+namespace {
+
+constexpr uint64_t kRoutes = ~uint64_t{0} - 1;
+constexpr Duration kSettleTime = std::chrono::milliseconds(50);
+// The network may come back between an attempt and the question why it failed; then it is tried again at
+// once, but not for ever: a router may claim what the route table denies.
+constexpr uint8_t kImmediateRetries = 3;
+// What a waiting request counts at least: the request itself costs memory too, however small its body.
+constexpr size_t kLeastCharge = 1024;
+
+bool saysNoRoute(long systemError) {
+  return systemError == ENETUNREACH || systemError == EHOSTUNREACH || systemError == ENETDOWN;
+}
+
+}  // namespace
+
+bool URLNetwork::retryOrWait(URLTransfer& transfer, CURLcode code, long systemError) {
+  if (!transfer.session->configuration.waitsForConnectivity) return false;
+  if (code != CURLE_COULDNT_CONNECT && code != CURLE_COULDNT_RESOLVE_HOST) return false;
+  if (code == CURLE_COULDNT_RESOLVE_HOST) transfer.addresses.clear();
+  if (!canLeave(transfer)) {
+    setAside(transfer);
+    return true;
+  }
+  const bool wasOffline =
+      code == CURLE_COULDNT_RESOLVE_HOST ? transfer.immediateRetries == 0 : saysNoRoute(systemError);
+  if (!wasOffline || transfer.immediateRetries >= kImmediateRetries) return false;
+  ++transfer.immediateRetries;
+  activate(transfer);
+  return true;
+}
+
+bool URLNetwork::canLeave(URLTransfer& transfer) {
+  if (transfer.addresses.empty()) return routes_.canResolve();
+  return std::any_of(transfer.addresses.begin(), transfer.addresses.end(),
+                     [&](const sockaddr_storage& address) {
+                       return routes_.isReachable(reinterpret_cast<const sockaddr&>(address),
+                                                  !transfer.request.allowsCellularAccess);
+                     });
+}
+
+void URLNetwork::setAside(URLTransfer& transfer) {
+  URLSessionState& session = *transfer.session;
+  transfer.phase = URLTransfer::Phase::waiting;
+  transfer.waitingCharge = std::max(transfer.request.body.size(), kLeastCharge);
+  session.waitingBytes += transfer.waitingCharge;
+  waiting_.fetch_add(1, std::memory_order_relaxed);
+  waitingBodyBytes_.fetch_add(transfer.request.body.size(), std::memory_order_relaxed);
+  armDeadline(transfer);
+  const std::shared_ptr<URLSessionState> kept = transfer.session;  // displacing may end its last request
+  const bool listening = routeEvents_.descriptor() >= 0;
+  while (session.waitingBytes > Limits::maxWaitingBytes) displaceOldest(session);
+  if (listening) return;
+  listenForRoutes();
+  // What changed before the subscription was not announced.
+  if (!settle_.isSet()) settle_.set(now_ + kSettleTime);
+}
+
+void URLNetwork::displaceOldest(URLSessionState& session) {
+  URLTransfer* oldest = session.transfers.first();
+  while (oldest->phase != URLTransfer::Phase::waiting) oldest = oldest->links.next;
+  displaced_.fetch_add(1, std::memory_order_relaxed);
+  if (counters_.addAndMayLog(Reason::waitingRequestDisplaced, now_)) {
+    log_.error(
+        "CurlURLSession(setAside): more than %zu bytes wait for connectivity, dropping the oldest request",
+        Limits::maxWaitingBytes);
+  }
+  fail(*oldest, kURLErrorWaitingTooMuch, "Too much was waiting for connectivity");
+}
+
+void URLNetwork::stopWaiting(URLTransfer& transfer) {
+  transfer.session->waitingBytes -= std::exchange(transfer.waitingCharge, 0);
+  waitingBodyBytes_.fetch_sub(transfer.request.body.size(), std::memory_order_relaxed);
+  if (waiting_.fetch_sub(1, std::memory_order_relaxed) != 1) return;
+  // Unsubscribing here would subscribe anew for each failed attempt: the slow timer does it when nothing
+  // waits.
+}
+
+void URLNetwork::listenForRoutes() {
+  if (!slowRetry_.isSet()) slowRetry_.set(now_ + options_.waitingRetryPeriod);
+  if (!routeEvents_.subscribe()) return;
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = kRoutes;
+  epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event);
+}
+
+void URLNetwork::routesChanged() {
+  routeEvents_.takeAll();
+  if (!settle_.isSet()) settle_.set(now_ + kSettleTime);
+}
+
+void URLNetwork::waitingTimer() {
+  if (waiting_.load(std::memory_order_relaxed) == 0) {
+    routeEvents_.unsubscribe();
+    return;
+  }
+  slowRetry_.set(now_ + options_.waitingRetryPeriod);
+  retryWaiting(true);
+}
+
+void URLNetwork::retryWaiting(bool all) {
+  for (URLSessionState* session = sessions_.first(); session != nullptr;) {
+    URLSessionState* nextSession = session->links.next;
+    const std::shared_ptr<URLSessionState> kept =
+        session->transfers.empty() ? nullptr : session->transfers.first()->session;
+    for (URLTransfer* transfer = session->transfers.first(); transfer != nullptr;) {
+      URLTransfer* next = transfer->links.next;
+      if (transfer->phase == URLTransfer::Phase::waiting && (all || canLeave(*transfer))) {
+        withdraw(*transfer);
+        transfer->immediateRetries = 0;
+        activate(*transfer);
+      }
+      transfer = next;
+    }
+    session = nextSession;
+  }
+}
+
+}  // namespace kyt

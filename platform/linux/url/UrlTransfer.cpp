@@ -1,0 +1,227 @@
+#include "platform/linux/url/UrlTransfer.h"
+
+#include <net/if.h>
+#include <strings.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "platform/Limits.h"
+#include "platform/linux/url/UrlNetwork.h"
+#include "platform/linux/url/UrlSessionState.h"
+
+namespace kyt {
+namespace {
+
+constexpr size_t kMaxReplyHeaderBytes = 256u << 10;
+constexpr size_t kMaxAddresses = 16;  // of one server that are remembered
+
+bool isControl(char c) {
+  return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
+}
+
+bool sameName(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
+}
+
+std::string_view trim(std::string_view text) {
+  const size_t first = text.find_first_not_of(" \t\r\n");
+  if (first == std::string_view::npos) return {};
+  return text.substr(first, text.find_last_not_of(" \t\r\n") - first + 1);
+}
+
+std::string withoutControls(std::string_view text) {
+  std::string result(text);
+  std::erase_if(result, isControl);
+  return result;
+}
+
+}  // namespace
+
+URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, URLRequest wanted, URLCompletion completion)
+    : session(std::move(state)),
+      request(std::move(wanted)),
+      deadline(
+          session->network->deadlines(),
+          [](void* transfer) {
+            auto* expired = static_cast<URLTransfer*>(transfer);
+            expired->session->network->transferDeadline(*expired);
+          },
+          this),
+      completion_(std::move(completion)) {}
+
+void URLTransfer::cancel() {
+  session->network->cancel(shared_from_this());
+}
+
+void URLTransfer::deliver() {
+  // What the completion holds is gone before anyone who waits for the last request goes on.
+  if (URLCompletion completion = std::move(completion_)) {
+    completion(std::move(data_), error_ ? std::nullopt : std::optional(std::move(response_)),
+               std::move(error_));
+  }
+  session->network->completionHasRun();
+}
+
+void URLTransfer::takeReply(int status) {
+  response_.status = status;
+  data_.emplace(std::string_view(body_));
+  body_ = {};
+}
+
+void URLTransfer::takeError(int32_t code, std::string description) {
+  clearReply();
+  error_.emplace(Error{kKYTURLErrorDomain, code, std::move(description)});
+}
+
+void URLTransfer::clearReply() {
+  body_ = {};
+  response_ = {};
+  headerBytes_ = 0;
+  moved_ = 0;
+  errorText[0] = 0;
+  addresses.clear();
+  onlyCellularRoutes = replyTooLong = false;
+}
+
+void URLTransfer::configure(CURL* easy) {
+  if (headerList_.empty()) buildHeaders();
+  curl_easy_setopt(easy, CURLOPT_PRIVATE, this);
+  curl_easy_setopt(easy, CURLOPT_URL, request.url.c_str());
+  curl_easy_setopt(easy, CURLOPT_HTTPHEADER, headerList_.data());
+  curl_easy_setopt(easy, CURLOPT_ERRORBUFFER, errorText);
+  curl_easy_setopt(easy, CURLOPT_HEADERFUNCTION, receiveHeader);
+  curl_easy_setopt(easy, CURLOPT_HEADERDATA, this);
+  curl_easy_setopt(easy, CURLOPT_WRITEFUNCTION, receiveBody);
+  curl_easy_setopt(easy, CURLOPT_WRITEDATA, this);
+  curl_easy_setopt(easy, CURLOPT_XFERINFOFUNCTION, noteProgress);
+  curl_easy_setopt(easy, CURLOPT_XFERINFODATA, this);
+  curl_easy_setopt(easy, CURLOPT_OPENSOCKETFUNCTION, openSocket);
+  curl_easy_setopt(easy, CURLOPT_OPENSOCKETDATA, this);
+  curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, request.maxRedirects > 0 ? 1L : 0L);
+  curl_easy_setopt(easy, CURLOPT_MAXREDIRS, static_cast<long>(request.maxRedirects));
+
+  curl_easy_setopt(easy, CURLOPT_HTTPGET, 1L);
+  curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, nullptr);
+  if (request.method == "HEAD") {
+    curl_easy_setopt(easy, CURLOPT_NOBODY, 1L);
+  } else if (request.method != "GET" || !request.body.empty()) {
+    const std::string_view body = request.body.view();
+    curl_easy_setopt(easy, CURLOPT_POST, 1L);
+    curl_easy_setopt(easy, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+    curl_easy_setopt(easy, CURLOPT_POSTFIELDS, body.empty() ? "" : body.data());
+    if (request.method != "POST") curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, request.method.c_str());
+  }
+}
+
+void URLTransfer::buildHeaders() {
+  std::erase_if(request.method, [](char c) { return isControl(c) || c == ' '; });
+  size_t bytes = 128 + session->configuration.sourceApplication.size();
+  for (const auto& [name, value] : request.headers) bytes += name.size() + value.size() + 3;
+  headerText_.reserve(bytes);
+  bool hasAccept = false, hasType = false;
+  for (const auto& [name, value] : request.headers) {
+    hasAccept = hasAccept || sameName(name, "Accept");
+    hasType = hasType || sameName(name, "Content-Type");
+    addHeader(name, value);
+  }
+  if (!session->configuration.sourceApplication.empty())
+    addHeader("X-KYT-Source-Application", session->configuration.sourceApplication);
+  // A name with nothing after its colon takes libcurl's own header away.
+  for (const auto& [suppressed, wanted] :
+       {std::pair("Expect:", true), std::pair("Accept:", !hasAccept), std::pair("Content-Type:", !hasType)}) {
+    if (wanted) headerText_.append(suppressed).push_back('\0');
+  }
+  headerList_.resize(static_cast<size_t>(std::count(headerText_.begin(), headerText_.end(), '\0')));
+  char* line = headerText_.data();
+  for (size_t i = 0; i < headerList_.size(); ++i) {
+    headerList_[i] = {line, i + 1 < headerList_.size() ? &headerList_[i + 1] : nullptr};
+    line += std::strlen(line) + 1;
+  }
+}
+
+void URLTransfer::addHeader(std::string_view name, std::string_view value) {
+  const auto isForbiddenInName = [](char c) { return isControl(c) || c == ':' || c == ' '; };
+  if (std::all_of(name.begin(), name.end(), isForbiddenInName)) return;
+  std::copy_if(name.begin(), name.end(), std::back_inserter(headerText_),
+               [&](char c) { return !isForbiddenInName(c); });
+  const bool isEmpty =
+      std::all_of(value.begin(), value.end(), [](char c) { return isControl(c) || c == ' '; });
+  if (isEmpty) {
+    headerText_.push_back(';');  // how libcurl is told of a header without a value
+  } else {
+    headerText_.append(": ");
+    std::copy_if(value.begin(), value.end(), std::back_inserter(headerText_),
+                 [](char c) { return !isControl(c); });
+  }
+  headerText_.push_back('\0');
+}
+
+size_t URLTransfer::receiveHeader(char* bytes, size_t size, size_t count, void* transfer) {
+  auto& self = *static_cast<URLTransfer*>(transfer);
+  const std::string_view line(bytes, size * count);
+  self.lastProgress = self.session->network->now();
+  self.headerBytes_ += line.size();
+  self.replyTooLong = self.headerBytes_ > kMaxReplyHeaderBytes;
+  if (self.replyTooLong) return 0;
+  if (line.starts_with("HTTP/")) {  // a redirect's or an interim reply's headers are forgotten
+    self.response_.headers.clear();
+    return line.size();
+  }
+  const bool isTrailer = !self.body_.empty();
+  const size_t colon = line.find(':');
+  if (isTrailer || colon == std::string_view::npos || colon == 0) return line.size();
+  if (line.front() == ' ' || line.front() == '\t') return line.size();
+  self.response_.headers.emplace_back(withoutControls(trim(line.substr(0, colon))),
+                                      withoutControls(trim(line.substr(colon + 1))));
+  return line.size();
+}
+
+size_t URLTransfer::receiveBody(char* bytes, size_t size, size_t count, void* transfer) {
+  auto& self = *static_cast<URLTransfer*>(transfer);
+  self.lastProgress = self.session->network->now();
+  self.replyTooLong = self.body_.size() + size * count > Limits::maxHTTPReplyBytes;
+  if (self.replyTooLong) return 0;
+  self.body_.append(bytes, size * count);
+  return size * count;
+}
+
+int URLTransfer::noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent) {
+  auto& self = *static_cast<URLTransfer*>(transfer);
+  if (self.moved_ != received + sent) {
+    self.moved_ = received + sent;
+    self.lastProgress = self.session->network->now();
+  }
+  return 0;
+}
+
+curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockaddr* address) {
+  auto& self = *static_cast<URLTransfer*>(transfer);
+  URLNetwork& network = *self.session->network;
+  if (self.addresses.size() < kMaxAddresses && address->addrlen <= sizeof(sockaddr_storage))
+    std::memcpy(&self.addresses.emplace_back(), &address->addr, address->addrlen);
+
+  std::string interface;
+  if (!self.request.allowsCellularAccess) {
+    std::optional<std::string> found = network.routes().interfaceAvoidingCellular(address->addr);
+    if (!found) {
+      self.onlyCellularRoutes = network.routes().isReachable(address->addr, false);
+      errno = ENETUNREACH;
+      return CURL_SOCKET_BAD;
+    }
+    interface = std::move(*found);
+  }
+  const int opened =
+      socket(address->family, address->socktype | SOCK_CLOEXEC | SOCK_NONBLOCK, address->protocol);
+  if (opened < 0) return CURL_SOCKET_BAD;
+  // Bound, so that a change of routes cannot move the connection. Where that is not permitted the route
+  // stands.
+  if (!interface.empty())
+    (void)setsockopt(opened, SOL_SOCKET, SO_BINDTODEVICE, interface.c_str(),
+                     static_cast<socklen_t>(interface.size() + 1));
+  network.socketOpened(opened);
+  return opened;
+}
+
+}  // namespace kyt

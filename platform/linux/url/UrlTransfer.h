@@ -1,0 +1,79 @@
+// One request on its way: from start() until its completion has run. It is the task handed to the caller,
+// what libcurl's callbacks work on, and what waits for connectivity.
+//
+// The request and completion are the starter's until they reach the network thread, then everything is the
+// network thread's until the result is handed to the session's delegate queue, where deliver() runs.
+#pragma once
+
+#include <curl/curl.h>
+#include <sys/socket.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/UrlSession.h"
+#include "platform/linux/url/DeadlineHeap.h"
+#include "platform/linux/url/LinkedList.h"
+
+namespace kyt {
+
+class URLConnectionPool;
+class URLNetwork;
+struct URLSessionState;
+
+class URLTransfer final : public URLTask, public std::enable_shared_from_this<URLTransfer> {
+ public:
+  URLTransfer(std::shared_ptr<URLSessionState> session, URLRequest request, URLCompletion completion);
+  void cancel() override;
+
+  // Delegate queue: calls the completion with the result.
+  void deliver();
+
+  // The rest is for the network thread.
+  enum class Phase : uint8_t { submitted, active, waiting, done };
+
+  // Sets what differs between requests; everything else was set when the handle was made.
+  void configure(CURL* handle);
+  // Forgets what an earlier attempt received.
+  void clearReply();
+  void takeReply(int status);
+  void takeError(int32_t code, std::string description);
+
+  const std::shared_ptr<URLSessionState> session;
+  URLRequest request;
+  Phase phase = Phase::submitted;
+  bool refused = false;  // started too late: the session was invalidated
+  uint8_t immediateRetries = 0;
+  bool onlyCellularRoutes = false;    // why the last attempt opened no connection
+  bool replyTooLong = false;          // … or ended
+  Links<URLTransfer> links;           // among its session's
+  std::shared_ptr<URLTransfer> self;  // keeps it alive while the network thread has it
+  CURL* handle = nullptr;             // while active
+  size_t waitingCharge = 0;           // while waiting
+  MonotonicTime started, lastProgress;
+  Deadline deadline;
+  std::vector<sockaddr_storage> addresses;  // that the last attempt tried to connect to
+  char errorText[CURL_ERROR_SIZE] = {};
+
+ private:
+  void buildHeaders();
+  void addHeader(std::string_view name, std::string_view value);
+  static size_t receiveHeader(char* bytes, size_t size, size_t count, void* transfer);
+  static size_t receiveBody(char* bytes, size_t size, size_t count, void* transfer);
+  static int noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent);
+  static curl_socket_t openSocket(void* transfer, curlsocktype, curl_sockaddr* address);
+
+  URLCompletion completion_;
+  std::string headerText_;              // all header lines, each ended by a zero
+  std::vector<curl_slist> headerList_;  // points into headerText_
+  std::string body_;
+  curl_off_t moved_ = 0;
+  size_t headerBytes_ = 0;
+  URLResponse response_;
+  std::optional<Data> data_;
+  std::optional<Error> error_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,400 @@
+#include <curl/curl.h>
+
+#include <set>
+
+#include "platform/Limits.h"
+#include "tests/linux/url/CurlUrlSessionFixture.h"
+
+namespace kyt {
+namespace {
+
+using namespace std::chrono_literals;
+using Behaviour = TestHTTPServer::Behaviour;
+
+class CurlURLSession : public CurlURLSessionFixture {
+ protected:
+  TestHTTPServer server_;
+};
+
+TestHTTPServer::Reply reply(Behaviour behaviour, std::string body = {}) {
+  TestHTTPServer::Reply made;
+  made.behaviour = behaviour;
+  made.body = std::move(body);
+  return made;
+}
+
+TEST_F(CurlURLSession, DeliversStatusHeadersAndBody) {
+  server_.setReply({.status = 203, .headers = {{"X-One", "1"}, {"x-two", " 2 "}}, .body = "hello"});
+  auto urls = session();
+  const Outcome outcome = perform(*urls, get(server_.url("/bag?version=8.0")));
+  EXPECT_EQ(outcome.status(), 203);
+  EXPECT_EQ(outcome.body(), "hello");
+  EXPECT_EQ(outcome.response()->header("x-one"), "1");
+  EXPECT_EQ(outcome.response()->header("X-Two"), "2");
+  EXPECT_FALSE(outcome.error());
+  EXPECT_EQ(server_.requests()[0].method, "GET");
+  EXPECT_EQ(server_.requests()[0].target, "/bag?version=8.0");
+  const URLFigures figures = factory().figures();
+  EXPECT_EQ(figures.started, 1u);
+  EXPECT_EQ(figures.completed, 1u);
+  EXPECT_EQ(figures.failed, 0u);
+}
+
+TEST_F(CurlURLSession, SendsTheHeadersGivenInTheirOrderAndNoOthersOfItsOwn) {
+  auto urls = session();
+  URLRequest request = post(server_.url("/events"), "{\"a\":1}");
+  request.headers = {{"X-KYT-Client-Name", "n"},     {"User-Agent", "KYTReporting/8.0 (x; y)"},
+                     {"Accept", "application/json"}, {"Content-Type", "application/json"},
+                     {"Content-Length", "7"},        {"X-Empty", ""}};
+  EXPECT_EQ(perform(*urls, std::move(request)).status(), 200);
+  EXPECT_EQ(
+      server_.requests()[0].raw,
+      "POST /events HTTP/1.1\r\nHost: 127.0.0.1:" + std::to_string(server_.port()) +
+          "\r\nX-KYT-Client-Name: n\r\nUser-Agent: KYTReporting/8.0 (x; y)\r\nAccept: application/json\r\n"
+          "Content-Type: application/json\r\nContent-Length: 7\r\nX-Empty:\r\n"
+          "X-KYT-Source-Application: com.vantu.system.diagnostics\r\n\r\n{\"a\":1}");
+}
+
+TEST_F(CurlURLSession, SendsNoSourceApplicationWhenNoneIsConfiguredAndCountsTheBodyItself) {
+  auto urls = session(false, "");
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), "abc")).status(), 200);
+  EXPECT_EQ(server_.requests()[0].raw,
+            "POST / HTTP/1.1\r\nHost: 127.0.0.1:" + std::to_string(server_.port()) +
+                "\r\nContent-Length: 3\r\n\r\nabc");
+}
+
+TEST_F(CurlURLSession, RemovesControlCharactersFromHeaders) {
+  auto urls = session(false, "");
+  URLRequest request = get(server_.url("/"));
+  request.headers = {{"X-A\r\nX-B", "one\r\nX-C: two\x7f\tthree"}};
+  EXPECT_EQ(perform(*urls, std::move(request)).status(), 200);
+  EXPECT_EQ(server_.requests()[0].header("X-AX-B"), "oneX-C: twothree");
+  EXPECT_EQ(server_.requests()[0].headers.size(), 2u);  // Host and this
+}
+
+TEST_F(CurlURLSession, PostsLargeBodiesWithoutAskingFirst) {
+  auto urls = session();
+  const std::string body(3u << 20, 'b');
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), body)).status(), 200);
+  EXPECT_EQ(server_.requests()[0].body, body);
+  EXPECT_EQ(server_.requests()[0].headerCount("Expect"), 0u);
+  EXPECT_EQ(server_.requests()[0].headerCount("Content-Length"), 1u);
+}
+
+TEST_F(CurlURLSession, ReusesTheConnectionOfASession) {
+  auto urls = session();
+  for (int i = 0; i < 20; ++i) EXPECT_EQ(perform(*urls, post(server_.url("/"), "x")).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 1u);
+}
+
+TEST_F(CurlURLSession, SharesNoConnectionBetweenSessions) {
+  auto one = session(), two = session();
+  EXPECT_EQ(perform(*one, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(perform(*two, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 2u);
+}
+
+TEST_F(CurlURLSession, SharesNoConnectionBetweenRequestsThatMayUseCellularInterfacesAndThoseThatMayNot) {
+  auto urls = session();
+  URLRequest wifiOnly = get(server_.url("/"));
+  wifiOnly.allowsCellularAccess = false;
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(perform(*urls, wifiOnly).status(), 200);
+  EXPECT_EQ(perform(*urls, wifiOnly).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 2u);
+}
+
+TEST_F(CurlURLSession, ReplacesAConnectionThatTheServerClosed) {
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), "x")).status(), 200);
+  server_.closeConnections();
+  ASSERT_TRUE(server_.waitForConnectionsOpen(0));
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), "y")).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 2u);
+}
+
+TEST_F(CurlURLSession, ClosesIdleConnections) {
+  options_.idleConnectionTime = 200ms;
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_TRUE(server_.waitForConnectionsOpen(0));
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 2u);
+}
+
+TEST_F(CurlURLSession, ClosesItsConnectionsWhenItIsInvalidated) {
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(server_.connectionsOpen(), 1u);
+  urls->finishTasksAndInvalidate();
+  EXPECT_TRUE(server_.waitForConnectionsOpen(0));
+}
+
+TEST_F(CurlURLSession, RunsCompletionsOnWorkersOfItsOwnOneAfterTheOther) {
+  auto urls = session();
+  std::mutex mutex;
+  int running = 0, most = 0, done = 0;
+  for (int i = 0; i < 50; ++i) {
+    urls->start(get(server_.url("/")), [&](auto, auto, auto) {
+      char name[16];
+      pthread_getname_np(pthread_self(), name, sizeof name);
+      EXPECT_EQ(std::string(name).substr(0, 7), "kyt-url");
+      {
+        std::lock_guard lock(mutex);
+        most = std::max(most, ++running);
+      }
+      std::this_thread::yield();
+      std::lock_guard lock(mutex);
+      --running;
+      ++done;
+    });
+  }
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+  EXPECT_EQ(most, 1);
+  EXPECT_EQ(done, 50);
+}
+
+TEST_F(CurlURLSession, TakesRequestsFromManyThreads) {
+  factory();
+  std::vector<std::thread> threads;
+  std::atomic<int> good{0};
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&] {
+      auto urls = session();
+      std::vector<Outcome> outcomes(50);
+      for (Outcome& outcome : outcomes) urls->start(post(server_.url("/"), "x"), outcome.completion());
+      for (Outcome& outcome : outcomes) good += outcome.wait() && outcome.status() == 200 ? 1 : 0;
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(good.load(), 200);
+  EXPECT_LE(server_.connectionsAccepted(), 32u);
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+}
+
+TEST_F(CurlURLSession, SendsARequestWithoutACompletion) {
+  auto urls = session();
+  urls->start(post(server_.url("/"), "fire"), nullptr);
+  EXPECT_TRUE(server_.waitForRequests(1));
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+  EXPECT_EQ(factory().figures().completed, 1u);
+}
+
+TEST_F(CurlURLSession, CompletesARequestInFlightAfterItsSessionIsReleased) {
+  server_.setReply(reply(Behaviour::hold, "late"));
+  auto urls = session();
+  Outcome outcome;
+  urls->start(get(server_.url("/")), outcome.completion());
+  ASSERT_TRUE(server_.waitForRequests(1));
+  urls.reset();
+  server_.release();
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.body(), "late");
+  EXPECT_TRUE(server_.waitForConnectionsOpen(0));
+}
+
+TEST_F(CurlURLSession, RefusesRequestsAfterItsInvalidation) {
+  auto urls = session();
+  urls->finishTasksAndInvalidate();
+  const Outcome outcome = perform(*urls, get(server_.url("/")));
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(outcome.error()->domain, "KYTURLErrorDomain");
+  EXPECT_EQ(server_.requestCount(), 0u);
+}
+
+TEST_F(CurlURLSession, CancelsOneRequest) {
+  server_.setReply(reply(Behaviour::hold));
+  auto urls = session();
+  Outcome outcome;
+  const auto task = urls->start(get(server_.url("/")), outcome.completion());
+  ASSERT_TRUE(server_.waitForRequests(1));
+  task->cancel();
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  task->cancel();
+  server_.setReply({});
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(outcome.calls(), 1);
+}
+
+TEST_F(CurlURLSession, CancelsEverythingAtShutDownAndStartsNothingAnyMore) {
+  server_.setReply(reply(Behaviour::hold));
+  auto one = session(), two = session();
+  Outcome a, b;
+  one->start(get(server_.url("/")), a.completion());
+  two->start(get(server_.url("/")), b.completion());
+  ASSERT_TRUE(server_.waitForRequests(2));
+  factory().cancelAll();
+  ASSERT_TRUE(a.wait() && b.wait());
+  EXPECT_EQ(a.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(b.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(perform(*one, get(server_.url("/"))).errorCode(), kURLErrorCancelled);
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+  EXPECT_EQ(server_.requestCount(), 2u);
+}
+
+TEST_F(CurlURLSession, DeliversWhatIsOutstandingBeforeTheFactoryIsGone) {
+  server_.setReply(reply(Behaviour::hold));
+  auto urls = session();
+  Outcome outcome;
+  urls->start(get(server_.url("/")), outcome.completion());
+  ASSERT_TRUE(server_.waitForRequests(1));
+  factory_.reset();
+  EXPECT_TRUE(outcome.isDone());
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  EXPECT_NE(urls->start(get(server_.url("/")), nullptr), nullptr);  // outlives it, starts nothing
+  EXPECT_EQ(server_.requestCount(), 1u);
+}
+
+TEST_F(CurlURLSession, GivesUpARequestThatMakesNoProgress) {
+  options_.noProgressTimeout = 300ms;
+  server_.setReply(reply(Behaviour::hold));
+  auto urls = session();
+  const Outcome outcome = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(outcome.errorCode(), CURLE_OPERATION_TIMEDOUT);
+  EXPECT_EQ(outcome.errorText(), "The request made no progress");
+}
+
+TEST_F(CurlURLSession, WaitsForASlowReplyThatMakesProgress) {
+  options_.noProgressTimeout = 1s;
+  server_.setReply({.body = "0123456789abcdef", .behaviour = Behaviour::drip, .interval = 120ms});
+  auto urls = session();
+  const Outcome outcome = perform(*urls, get(server_.url("/")));
+  EXPECT_EQ(outcome.body(), "0123456789abcdef");
+}
+
+TEST_F(CurlURLSession, EndsARequestAtItsTimeOutProgressOrNot) {
+  server_.setReply({.body = std::string(1000, 'x'), .behaviour = Behaviour::drip, .interval = 20ms});
+  auto urls = session();
+  URLRequest request = get(server_.url("/"));
+  request.timeout = 400ms;
+  const auto before = std::chrono::steady_clock::now();
+  const Outcome outcome = perform(*urls, std::move(request));
+  EXPECT_EQ(outcome.errorCode(), CURLE_OPERATION_TIMEDOUT);
+  EXPECT_EQ(outcome.errorText(), "The request timed out");
+  EXPECT_GE(std::chrono::steady_clock::now() - before, 400ms);
+  EXPECT_FALSE(outcome.data());
+  EXPECT_FALSE(outcome.response());
+}
+
+TEST_F(CurlURLSession, TakesAReplyOfTheGreatestSizeAndRefusesALargerOne) {
+  auto urls = session();
+  const std::string largest(Limits::maxHTTPReplyBytes, 'r');
+  server_.setReply({.body = largest});
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).body(), largest);
+  server_.setReply({.body = std::string(5u << 20, 'r')});
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).errorCode(), CURLE_FILESIZE_EXCEEDED);
+  // … also when its size is not announced.
+  std::string unannounced = "HTTP/1.1 200 OK\r\n\r\n";
+  unannounced.append(5u << 20, 'r');
+  server_.setReply(reply(Behaviour::raw, unannounced));
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).errorCode(), CURLE_FILESIZE_EXCEEDED);
+}
+
+TEST_F(CurlURLSession, RefusesEndlessHeaders) {
+  std::string head = "HTTP/1.1 200 OK\r\n";
+  for (int i = 0; i < 300; ++i) head += "X-" + std::to_string(i) + ": " + std::string(1000, 'h') + "\r\n";
+  server_.setReply(reply(Behaviour::raw, head + "Content-Length: 0\r\n\r\n"));
+  auto urls = session();
+  EXPECT_NE(perform(*urls, get(server_.url("/"))).errorCode(), 0);
+}
+
+TEST_F(CurlURLSession, ReportsRepliesThatBreakOff) {
+  auto urls = session();
+  server_.setReply(reply(Behaviour::stopMidBody, std::string(1000, 'x')));
+  const Outcome partial = perform(*urls, get(server_.url("/")));
+  EXPECT_EQ(partial.errorCode(), CURLE_PARTIAL_FILE);
+  EXPECT_FALSE(partial.data());
+  EXPECT_FALSE(partial.response());
+  server_.setReply(reply(Behaviour::close));
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).errorCode(), CURLE_GOT_NOTHING);
+  EXPECT_EQ(factory().figures().failed, 2u);
+}
+
+TEST_F(CurlURLSession, ReportsGarbage) {
+  server_.setReply(reply(Behaviour::raw, "\x01\x02garbage\r\n\r\nmore garbage"));
+  auto urls = session();
+  EXPECT_NE(perform(*urls, get(server_.url("/"))).errorCode(), 0);
+}
+
+TEST_F(CurlURLSession, ReportsARefusedConnectionAtOnceEvenIfItWaitsForConnectivity) {
+  const std::string url = server_.url("/");
+  server_.stop();
+  auto urls = session(true);
+  const Outcome outcome = perform(*urls, get(url));
+  EXPECT_EQ(outcome.errorCode(), CURLE_COULDNT_CONNECT);
+  EXPECT_FALSE(outcome.errorText().empty());
+  EXPECT_EQ(factory().figures().waiting, 0u);
+}
+
+TEST_F(CurlURLSession, SpeaksHTTPAlone) {
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get("file:///etc/hostname")).errorCode(), CURLE_UNSUPPORTED_PROTOCOL);
+  EXPECT_EQ(perform(*urls, get("ftp://127.0.0.1/")).errorCode(), CURLE_UNSUPPORTED_PROTOCOL);
+  EXPECT_NE(perform(*urls, get("")).errorCode(), 0);
+  EXPECT_NE(perform(*urls, get("http://127.0.0.1:99999/")).errorCode(), 0);
+  EXPECT_NE(perform(*urls, get("http://a b\r\nX: y/")).errorCode(), 0);
+}
+
+TEST_F(CurlURLSession, FollowsNoRedirectOfAPost) {
+  server_.setReply({.status = 302, .headers = {{"Location", server_.url("/other")}}});
+  auto urls = session();
+  const Outcome outcome = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(outcome.status(), 302);
+  EXPECT_EQ(server_.requestCount(), 1u);
+}
+
+TEST_F(CurlURLSession, IgnoresProxiesOfTheEnvironment) {
+  setenv("http_proxy", "http://127.0.0.1:1", 1);
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  unsetenv("http_proxy");
+}
+
+TEST_F(CurlURLSession, KeepsNoCookies) {
+  server_.setReply({.headers = {{"Set-Cookie", "a=b"}}});
+  auto urls = session();
+  perform(*urls, get(server_.url("/")));
+  perform(*urls, get(server_.url("/")));
+  EXPECT_EQ(server_.requests()[1].headerCount("Cookie"), 0u);
+}
+
+TEST_F(CurlURLSession, AnswersWithoutABody) {
+  server_.setReply({.status = 304, .headers = {{"Last-Modified", "then"}}});
+  auto urls = session();
+  URLRequest request = get(server_.url("/"));
+  request.headers = {{"If-Modified-Since", "then"}};
+  const Outcome outcome = perform(*urls, std::move(request));
+  EXPECT_EQ(outcome.status(), 304);
+  ASSERT_TRUE(outcome.data());
+  EXPECT_TRUE(outcome.data()->empty());
+  EXPECT_EQ(outcome.response()->header("last-modified"), "then");
+}
+
+TEST_F(CurlURLSession, ForgetsTheMethodAndBodyOfTheRequestBefore) {
+  auto urls = session();
+  perform(*urls, post(server_.url("/"), "abc"));
+  perform(*urls, get(server_.url("/")));
+  URLRequest put = post(server_.url("/"), "put");
+  put.method = "PUT";
+  perform(*urls, std::move(put));
+  perform(*urls, post(server_.url("/"), ""));
+  const auto requests = server_.requests();
+  ASSERT_EQ(requests.size(), 4u);
+  EXPECT_EQ(requests[1].method + requests[1].body, "GET");
+  EXPECT_EQ(requests[1].headerCount("Content-Length"), 0u);
+  EXPECT_EQ(requests[2].method + requests[2].body, "PUTput");
+  EXPECT_EQ(requests[3].method + requests[3].body, "POST");
+  EXPECT_EQ(requests[3].header("Content-Length"), "0");
+}
+
+TEST_F(CurlURLSession, CarriesManyIdleSessions) {
+  std::vector<std::unique_ptr<URLSession>> many(10000);
+  for (auto& one : many) one = session(true);
+  EXPECT_EQ(perform(*many[5000], get(server_.url("/"))).status(), 200);
+  many.clear();
+  EXPECT_TRUE(server_.waitForConnectionsOpen(0));
+}
+
+}  // namespace
+}  // namespace kyt
