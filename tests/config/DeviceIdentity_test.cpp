@@ -1,0 +1,100 @@
+#include "config/DeviceIdentity.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "tests/support/TestPlatform.h"
+
+namespace kyt {
+namespace {
+
+TEST(DeviceIdentity, AsksForEachFactByItsKey) {
+  TestPlatform test;
+  for (const char* key :
+       {"ProductVersion", "BuildVersion", "ProductType", "DeviceName", "HWModelStr", "SerialNumber"})
+    test.deviceProperties.setProperty(key, std::string("the ") + key);
+  EXPECT_EQ(test.deviceIdentity.productVersion(), String("the ProductVersion"));
+  EXPECT_EQ(test.deviceIdentity.buildVersion(), String("the BuildVersion"));
+  EXPECT_EQ(test.deviceIdentity.productType(), String("the ProductType"));
+  EXPECT_EQ(test.deviceIdentity.deviceName(), String("the DeviceName"));
+  EXPECT_EQ(test.deviceIdentity.hardwareModel(), String("the HWModelStr"));
+  EXPECT_EQ(test.deviceIdentity.serialNumber(), String("the SerialNumber"));
+}
+
+TEST(DeviceIdentity, AnswersNothingForAFactThatIsMissing) {
+  TestPlatform test;
+  EXPECT_FALSE(test.deviceIdentity.productVersion());
+  EXPECT_FALSE(test.deviceIdentity.serialNumber());
+}
+
+TEST(DeviceIdentity, FillsTheBufferWithFortyCharacters) {
+  TestPlatform test;
+  const std::string identifier(40, 'a');
+  test.deviceProperties.setProperty("UniqueDeviceID", identifier);
+  char buffer[kDeviceIDSize];
+  std::memset(buffer, 'x', sizeof buffer);
+  test.deviceIdentity.deviceUniqueIDCString(buffer, kDeviceIDSize);
+  EXPECT_EQ(buffer[40], '\0');
+  EXPECT_EQ(identifier, buffer);
+}
+
+TEST(DeviceIdentity, ForcesTheLastByteToZeroForAShorterIdentifier) {
+  TestPlatform test;
+  test.deviceProperties.setProperty("UniqueDeviceID", "abc");
+  char buffer[8];
+  std::memset(buffer, 'x', sizeof buffer);
+  test.deviceIdentity.deviceUniqueIDCString(buffer, sizeof buffer);
+  EXPECT_STREQ(buffer, "abc");
+  EXPECT_EQ(buffer[7], '\0');
+}
+
+TEST(DeviceIdentity, LeavesTheBufferForAnIdentifierThatIsTooLongOrMissing) {
+  TestPlatform test;
+  char buffer[kDeviceIDSize] = "as it was";
+  test.deviceIdentity.deviceUniqueIDCString(buffer, kDeviceIDSize);
+  EXPECT_STREQ(buffer, "as it was");
+  test.deviceProperties.setProperty("UniqueDeviceID", std::string(41, 'a'));
+  test.deviceIdentity.deviceUniqueIDCString(buffer, kDeviceIDSize);
+  EXPECT_STREQ(buffer, "as it was");
+}
+
+TEST(DeviceIdentity, IsInternalOnlyForTheInternalReleaseType) {
+  for (const char* type : {"Beta", "internal", ""}) {
+    TestPlatform test;
+    test.deviceProperties.setProperty("ReleaseType", type);
+    EXPECT_FALSE(test.deviceIdentity.isInternalBuild()) << type;
+  }
+  TestPlatform without;
+  EXPECT_FALSE(without.deviceIdentity.isInternalBuild());
+  TestPlatform internal;
+  internal.deviceProperties.setProperty("ReleaseType", "Internal");
+  EXPECT_TRUE(internal.deviceIdentity.isInternalBuild());
+}
+
+TEST(DeviceIdentity, AsksForTheReleaseTypeOnce) {
+  TestPlatform test;
+  EXPECT_FALSE(test.deviceIdentity.isInternalBuild());
+  test.deviceProperties.setProperty("ReleaseType", "Internal");
+  EXPECT_FALSE(test.deviceIdentity.isInternalBuild());
+  EXPECT_EQ(test.deviceProperties.queries("ReleaseType"), 1);
+}
+
+TEST(DeviceIdentity, KeepsOneInstanceUUIDUnderConcurrentFirstCalls) {
+  TestPlatform test;
+  std::vector<std::string> answers(4);
+  {
+    std::vector<std::jthread> threads;
+    for (std::string& answer : answers)
+      threads.emplace_back([&] { answer = test.deviceIdentity.processInstanceUUID(); });
+  }
+  for (const std::string& answer : answers) EXPECT_EQ(answer, answers[0]);
+  EXPECT_EQ(answers[0], uuidText(FixedRandom::uuidNumber(1)));
+  EXPECT_EQ(test.deviceIdentity.processInstanceUUID(), answers[0]);
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,352 @@
+// The life and configuration of a session.
+#include "session/ReportingdSession.h"
+
+#include "platform/System.h"
+#include "platform/UserDefaults.h"
+#include "tests/session/SessionFixture.h"
+
+namespace kyt {
+namespace {
+
+class ReportingdSessionLife : public SessionFixture {};
+
+TEST_F(ReportingdSessionLife, HasARandomIdentifierAndALogLine) {
+  EXPECT_EQ(client_.session->sessionIDString(), base64(FixedRandom::uuidNumber(1)));
+  EXPECT_EQ(client_.session->sessionIDString().size(), 24U);
+  EXPECT_TRUE(client_.session->sessionIDString().view().ends_with("=="));
+  EXPECT_TRUE(logged(LogLevel::debug,
+                     "initWithSessionDelegate: ReportingdSession initWithSessionDelegate:<Delegate>"));
+  EXPECT_TRUE(logged(LogLevel::debug, "initWithSessionDelegate: Initialized session with UUID " +
+                                          client_.session->sessionIDString().str()));
+}
+
+TEST_F(ReportingdSessionLife, RegistersWithTheHierarchyWhenIdentified) {
+  client_.session->setSessionInfo(sessionInfoAtLevel(3), std::nullopt, nullptr, true);
+  EXPECT_TRUE(logged(LogLevel::debug, "setSessionInfo: Configuring session 42"));
+  EXPECT_EQ(client_.session->sessionID(), 42U);
+  EXPECT_EQ(client_.session->hierarchyLevel(), 3U);
+  EXPECT_EQ(client_.session->hierarchyToken(), String("T"));
+  EXPECT_TRUE(client_.session->hasAggregator());
+  EXPECT_EQ(delegate_.calls, std::vector<std::string>{"correlated 3"});
+}
+
+TEST_F(ReportingdSessionLife, ASecondIdentificationOverwritesTheFirst) {
+  client_.session->setSessionInfo(sessionInfoAtLevel(3), userInfo(), nullptr, true);
+  client_.session->setSessionInfo(sessionInfo(43), std::nullopt, nullptr, false);
+  EXPECT_EQ(client_.session->sessionID(), 43U);
+  EXPECT_EQ(client_.session->hierarchyLevel(), 0U);
+  EXPECT_FALSE(client_.session->hierarchyToken());
+  EXPECT_FALSE(client_.session->userInfo());
+  EXPECT_FALSE(client_.session->hasAggregator());
+  EXPECT_EQ(delegate_.calls, (std::vector<std::string>{"correlated 3", "correlated 0"}));
+}
+
+TEST_F(ReportingdSessionLife, TakesAHierarchyTokenThatIsNoDictionaryForNone) {
+  Dictionary info = sessionInfo();
+  info.set(kKYTReportingSessionInfoHierarchyToken, "T");
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_EQ(client_.session->hierarchyLevel(), 0U);
+  EXPECT_FALSE(client_.session->hierarchyToken());
+}
+
+TEST_F(ReportingdSessionLife, ReadsANegativeLevelAsAnUnsignedNumber) {
+  client_.session->setSessionInfo(sessionInfoAtLevel(-1), std::nullopt, nullptr, false);
+  EXPECT_EQ(client_.session->hierarchyLevel(), 4294967295U);
+}
+
+TEST_F(ReportingdSessionLife, KeepsUserInformationThatWasNotPromisedWithAnError) {
+  client_.session->setSessionInfo(sessionInfo(1, false), userInfo(), nullptr, false);
+  EXPECT_TRUE(
+      logged(LogLevel::error, "setSessionInfo: Configure session: user info provided without requiring it"));
+  EXPECT_EQ(client_.session->userInfo(), userInfo());
+  test_.sink.clear();
+  client_.session->setSessionInfo(sessionInfo(1, true), userInfo(), nullptr, false);
+  EXPECT_EQ(test_.sink.count(LogLevel::error, "setSessionInfo"), 0U);
+}
+
+TEST_F(ReportingdSessionLife, StaysWithoutBackEndsWithoutAStorebag) {
+  client_.session->setSessionInfo(sessionInfo(), std::nullopt, nullptr, false);
+  std::optional<Array> states = Array{"unset"};
+  client_.session->startConfigWithCompletionHandler([&](std::optional<Array> s) { states = std::move(s); });
+  EXPECT_FALSE(states);
+  EXPECT_TRUE(
+      logged(LogLevel::debug, "startConfigWithCompletionHandler: Starting configuration for session 42"));
+  EXPECT_TRUE(factory_.made().empty());
+  EXPECT_TRUE(send(message(1, 2)).isNull());
+  EXPECT_TRUE(logged(LogLevel::debug, "sendMessageWithDictionary: No backends available to send message"));
+}
+
+TEST_F(ReportingdSessionLife, ConfiguresItsBackEndsFromTheStorebag) {
+  test_.deviceProperties.setProperty("UniqueDeviceID", "device");
+  client_ = newClient();
+  client_.session->setSessionInfo(sessionInfo(), userInfo(), nullptr, false);
+  delegate_.storebag = table({"httppost", "dashboard"});
+  delegate_.storebagVersion = String("1.5");
+  std::optional<Array> states;
+  client_.session->startConfigWithCompletionHandler([&](std::optional<Array> s) { states = std::move(s); });
+  EXPECT_EQ(states, (Array{"httppost", "dashboard"}));
+  EXPECT_EQ(client_.session->storebagVersion(), String("1.5"));
+  ASSERT_EQ(factory_.calls().size(), 1U);
+  EXPECT_EQ(factory_.calls()[0].table, delegate_.storebag);
+  EXPECT_EQ(factory_.calls()[0].sessionInfo, sessionInfo());
+  EXPECT_EQ(factory_.calls()[0].userInfo, userInfo());
+  EXPECT_EQ(factory_.calls()[0].udid, "device");
+  for (const char* name : {"httppost", "dashboard"}) {
+    EXPECT_NE(backend(name).connectivity(), nullptr);
+    EXPECT_EQ(backend(name).combinedSessionIDString(), client_.session->sessionIDString());
+    EXPECT_EQ(backend(name).calls, (std::vector<std::string>{"updateState", "send"}));
+  }
+  EXPECT_EQ(backend("httppost").connectivity(), backend("dashboard").connectivity());
+  EXPECT_EQ(delegate_.calls, (std::vector<std::string>{"correlated 0", "storebag", "downstream"}));
+}
+
+TEST_F(ReportingdSessionLife, LeavesADeviceIdentifierOverFortyCharactersEmpty) {
+  test_.deviceProperties.setProperty("UniqueDeviceID", std::string(41, 'x'));
+  client_ = newClient();
+  configure({"httppost"});
+  EXPECT_EQ(factory_.calls()[0].udid, "");
+}
+
+TEST_F(ReportingdSessionLife, TakesATableWithoutKnownNamesForNoBackEnds) {
+  factory_.unknownNames = {"nonsense"};
+  EXPECT_FALSE(configure({"nonsense"}));
+  std::optional<Error> error;
+  client_.session->flushMessagesWithCompletion([&](Value, std::optional<Error> e) { error = std::move(e); });
+  EXPECT_EQ(error, (Error{"KYTReportingErrorDomain", -1, "No backends available to send message"}));
+}
+
+TEST_F(ReportingdSessionLife, ASecondConfigurationFlushesAndCleansUpTheFirstBackEnds) {
+  configure({"httppost"});
+  const auto first = factory_.latest("httppost");
+  configure({"httppost"});
+  const auto second = factory_.latest("httppost");
+  ASSERT_NE(first, second);
+  EXPECT_EQ(first->calls, (std::vector<std::string>{"updateState", "send", "flush", "cleanup"}));
+  EXPECT_EQ(second->calls, (std::vector<std::string>{"updateState", "send"}));
+}
+
+TEST_F(ReportingdSessionLife, SendsAShortStartMessage) {
+  test_.deviceProperties.setCountryCode("DE");
+  configure({"httppost"});
+  ASSERT_EQ(backend("httppost").sent.size(), 1U);
+  const RecordingBackend::Sent& start = backend("httppost").sent[0];
+  EXPECT_EQ(start.method, 0);
+  EXPECT_EQ(start.respCode, 0);
+  EXPECT_EQ(start.flag, 0);
+  EXPECT_EQ(start.eventID, 1);
+  EXPECT_EQ(start.timestamp, test_.clock.timeOfDay());
+  EXPECT_EQ(start.message,
+            (Dictionary{{"ClientData", Dictionary{{"AutomaticTimeSet", true}, {"Locale", "DE"}}}}));
+  EXPECT_TRUE(logged(LogLevel::debug, "internalSendMessage: Sent internal message (method:0 respCode:0)"));
+  for (const char* key : {"ProductVersion", "BuildVersion", "DeviceName", "SerialNumber", "HWModelStr"})
+    EXPECT_EQ(test_.deviceProperties.queries(key), 1) << key;
+}
+
+TEST_F(ReportingdSessionLife, SaysUnknownForWhatIsMissing) {
+  test_.userDefaults.put(kTimedDefaultsDomain, "TMAutomaticTimeZoneEnabled", false);
+  configure({"httppost"});
+  EXPECT_EQ(backend("httppost").sent[0].message,
+            (Dictionary{{"ClientData", Dictionary{{"AutomaticTimeSet", false}, {"Locale", "Unknown"}}}}));
+}
+
+TEST_F(ReportingdSessionLife, TellsMoreOfTheDeviceOnAnInternalBuild) {
+  test_.deviceProperties.setProperty("ReleaseType", "Internal");
+  test_.deviceProperties.setProperty("ProductVersion", "12");
+  test_.deviceProperties.setProperty("BuildVersion", "12A1");
+  test_.deviceProperties.setProperty("HWModelStr", "board");
+  test_.clientBundle.setVersion(std::nullopt);
+  configure({"httppost"});
+  EXPECT_EQ(backend("httppost").sent[0].message,
+            (Dictionary{{"ClientData", Dictionary{{"SerialNum", "Unknown"},
+                                                  {"Version", "12"},
+                                                  {"Build", "12A1"},
+                                                  {"Hardware", "board"},
+                                                  {"Product", "Unknown"},
+                                                  {"ReportVers", "8.0"},
+                                                  {"Locale", "Unknown"},
+                                                  {"AutomaticTimeSet", true}}}}));
+}
+
+class ReportingdSessionUserInfo : public SessionFixture {
+ protected:
+  void fetchStates(std::optional<Dictionary> info) {
+    client_.session->fetchStatesWithUserInfo(std::move(info),
+                                             [this](std::optional<Array> s) { states_ = s; });
+  }
+  std::optional<Array> states_;
+};
+
+TEST_F(ReportingdSessionUserInfo, UpdatesStatesOnTheFirst) {
+  configure({"httppost"});
+  fetchStates(userInfo());
+  EXPECT_EQ(states_, (Array{"httppost"}));
+  EXPECT_TRUE(logged(LogLevel::debug, "fetchStatesWithUserInfo: Fetching states for session 42"));
+  EXPECT_TRUE(logged(LogLevel::debug, "receivedUserInfo: Received new user info for session 42"));
+  EXPECT_EQ(backend("httppost").userInfoDict(), userInfo());
+  EXPECT_EQ(backend("httppost").updateCount, 2);
+  EXPECT_EQ(delegate_.count("downstream"), 2);
+}
+
+TEST_F(ReportingdSessionUserInfo, IsPassedOnWithoutAStateUpdateWhenTheNamesAreTheSame) {
+  configure({"httppost"});
+  fetchStates(userInfo());
+  Dictionary more = userInfo();
+  more.set("More", 1);
+  fetchStates(more);
+  EXPECT_EQ(backend("httppost").userInfoCount, 2);
+  EXPECT_EQ(backend("httppost").userInfoDict(), more);
+  EXPECT_EQ(backend("httppost").updateCount, 2);
+}
+
+TEST_F(ReportingdSessionUserInfo, CountsAsChangedByEitherName) {
+  configure({"httppost"});
+  fetchStates(userInfo("a", "s"));
+  fetchStates(userInfo("b", "s"));
+  EXPECT_EQ(backend("httppost").updateCount, 3);
+  fetchStates(userInfo("b", "t"));
+  EXPECT_EQ(backend("httppost").updateCount, 4);
+}
+
+TEST_F(ReportingdSessionUserInfo, AMissingNameOnTheNewSideAlwaysCountsAsChanged) {
+  configure({"httppost"});
+  const Dictionary nameless{{"Other", 1}};
+  fetchStates(nameless);
+  fetchStates(nameless);
+  EXPECT_EQ(backend("httppost").updateCount, 3);
+}
+
+TEST_F(ReportingdSessionUserInfo, StaysWhenNoneComesAlthoughItIsRequired) {
+  configure({"httppost"});
+  fetchStates(userInfo());
+  fetchStates(std::nullopt);
+  EXPECT_EQ(client_.session->userInfo(), userInfo());
+  EXPECT_EQ(backend("httppost").userInfoCount, 1);
+}
+
+TEST_F(ReportingdSessionUserInfo, GoesWhenNoneComesAndItIsNotRequired) {
+  configure(client_, {"httppost"}, sessionInfo(42, false));
+  fetchStates(userInfo());
+  fetchStates(std::nullopt);
+  EXPECT_FALSE(client_.session->userInfo());
+  EXPECT_FALSE(backend("httppost").userInfoDict());
+  EXPECT_EQ(backend("httppost").updateCount, 3);
+}
+
+TEST_F(ReportingdSessionUserInfo, NoneOnNoneDoesNothing) {
+  configure({"httppost"});
+  fetchStates(std::nullopt);
+  EXPECT_EQ(backend("httppost").userInfoCount, 0);
+  EXPECT_EQ(states_, (Array{"httppost"}));
+}
+
+TEST_F(ReportingdSessionUserInfo, TheDigestKeyGoesToOneBackEndAndItsAlgorithmIsForgotten) {
+  configure({"httppost", "qrs"});
+  client_.session->setDigestKey(Data("secret"), 5);
+  EXPECT_EQ(backend("qrs").digestKey(), Data("secret"));
+  EXPECT_EQ(backend("qrs").digestAlgorithm(), 5);
+  EXPECT_FALSE(backend("httppost").digestKey());
+  fetchStates(userInfo());
+  EXPECT_EQ(backend("qrs").digestKey(), Data("secret"));
+  EXPECT_EQ(backend("qrs").digestAlgorithm(), 0);
+  EXPECT_FALSE(backend("httppost").digestKey());
+}
+
+TEST_F(ReportingdSessionUserInfo, AKeyThatCameBeforeTheBackEndsIsHandedOverLater) {
+  client_.session->setDigestKey(Data("secret"), 5);
+  configure({"qrs"});
+  EXPECT_FALSE(backend("qrs").digestKey());
+  fetchStates(userInfo());
+  EXPECT_EQ(backend("qrs").digestKey(), Data("secret"));
+}
+
+class ReportingdSessionDisplayURL : public SessionFixture {
+ protected:
+  std::string displayURL() {
+    std::string answer;
+    client_.session->fetchDisplayURL([&](String text) { answer = text.str(); });
+    return answer;
+  }
+};
+
+TEST_F(ReportingdSessionDisplayURL, IsNotAvailableWithoutBackEnds) {
+  EXPECT_EQ(displayURL(), "URL not available");
+  EXPECT_TRUE(logged(LogLevel::debug, "fetchDisplayURL: Fetching display URL for session 0"));
+}
+
+TEST_F(ReportingdSessionDisplayURL, IsTheFirstPostersThenTheSecondsThenTheDashboards) {
+  configure({"dashboard", "httppost2", "httppost"});
+  EXPECT_EQ(displayURL(), "URL not available");
+  backend("dashboard").setDisplayURL(String("d"));
+  EXPECT_EQ(displayURL(), "d");
+  backend("httppost2").setDisplayURL(String("h2"));
+  EXPECT_EQ(displayURL(), "h2");
+  backend("httppost").setDisplayURL(String("h1"));
+  EXPECT_EQ(displayURL(), "h1");
+}
+
+TEST_F(ReportingdSessionDisplayURL, IsTheDashboardsWhenThereIsNoOther) {
+  configure({"dashboard"});
+  backend("dashboard").setDisplayURL(String("d"));
+  EXPECT_EQ(displayURL(), "d");
+}
+
+class ReportingdSessionEnd : public SessionFixture {};
+
+TEST_F(ReportingdSessionEnd, SendsAStopMessageThenFlushesThenCleansUp) {
+  configure({"httppost"});
+  const auto backend = factory_.latest("httppost");
+  client_.session->finishSessionGracefully();
+  EXPECT_TRUE(logged(LogLevel::debug, "finishSessionGracefully: Session 42 has been finished gracefully"));
+  client_.session->dealloc();
+  EXPECT_TRUE(logged(LogLevel::debug, "dealloc: ReportingdSession dealloc: 42"));
+  EXPECT_EQ(backend->calls, (std::vector<std::string>{"updateState", "send", "send", "flush", "cleanup"}));
+  const RecordingBackend::Sent& stop = backend->sent[1];
+  EXPECT_EQ(stop.method, 0);
+  EXPECT_EQ(stop.respCode, 1);
+  EXPECT_EQ(
+      stop.message,
+      (Dictionary{{"ClientData",
+                   Dictionary{{"StorebagVersion", "1.5"}, {"GracefulTermination", true}, {"Health", 1}}}}));
+  EXPECT_EQ(client_.session->connection(), nullptr);
+}
+
+TEST_F(ReportingdSessionEnd, SaysSoWhenItWasNotGraceful) {
+  configure({"httppost"});
+  client_.session->dealloc();
+  EXPECT_EQ(*factory_.latest("httppost")
+                 ->sent[1]
+                 .message.find("ClientData")
+                 ->dictionary()
+                 ->find("GracefulTermination"),
+            Value(false));
+}
+
+TEST_F(ReportingdSessionEnd, TheStopMessageHasNoVersionWhenTheSessionGotNone) {
+  configure({"httppost"});
+  client_.session->setStorebagVersion(std::nullopt);
+  client_.session->dealloc();
+  EXPECT_EQ(factory_.latest("httppost")->sent[1].message,
+            (Dictionary{{"ClientData", Dictionary{{"Health", 1}}}}));
+}
+
+TEST_F(ReportingdSessionEnd, WithoutBackEndsOnlyEndsAggregation) {
+  client_.session->setSessionInfo(sessionInfo(), std::nullopt, nullptr, true);
+  client_.session->dealloc();
+  EXPECT_EQ(test_.sink.count("flushMessagesWithCompletion"), 0U);
+  EXPECT_EQ(test_.sink.count("internalSendMessage"), 0U);
+  EXPECT_EQ(client_.connection->messagesToClient().size(), 1U);
+}
+
+TEST_F(ReportingdSessionEnd, AFlushAnswerAfterTheEndIsHarmless) {
+  factory_.prepare = [](RecordingBackend& backend) { backend.holdsFlushes = true; };
+  configure({"httppost"});
+  const auto backend = factory_.latest("httppost");
+  client_.session->dealloc();
+  client_.session.reset();
+  ASSERT_EQ(backend->flushes.size(), 1U);
+  backend->flushes[0]("late", std::nullopt);
+  EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[httppost -> flushMessages] late"});
+}
+
+}  // namespace
+}  // namespace kyt
