@@ -41,6 +41,14 @@ std::string head(const TestHTTPServer::Reply& reply, bool withLength) {
   return text + "\r\n";
 }
 
+std::string peerOf(int socket) {
+  sockaddr_in address{};
+  socklen_t size = sizeof address;
+  char text[INET_ADDRSTRLEN] = {};
+  if (getpeername(socket, reinterpret_cast<sockaddr*>(&address), &size) != 0) return {};
+  return inet_ntop(AF_INET, &address.sin_addr, text, sizeof text);
+}
+
 using Context = std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)>;
 
 Context makeContext(const TestHTTPServer::Options& options) {
@@ -228,6 +236,7 @@ class TestHTTPServer::Implementation {
       if (stream.handshake()) {
         while (std::optional<Request> request = readRequest(stream, buffer)) {
           request->connection = number;
+          request->peer = peerOf(socket);
           request->tlsVersion = stream.tlsVersion();
           if (!answer(stream, *std::move(request))) break;
         }

@@ -30,6 +30,7 @@ class TestHTTPServer {
     std::string body;
     std::string raw;         // head and body, byte for byte
     size_t connection = 0;   // numbered from 1 in the order of acceptance
+    std::string peer;        // the client's address
     std::string tlsVersion;  // "TLSv1.3"; empty over plain HTTP
     // The first header of that name, compared without case.
     [[nodiscard]] std::optional<std::string> header(std::string_view name) const;

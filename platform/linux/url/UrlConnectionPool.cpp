@@ -77,6 +77,7 @@ CURL* URLConnectionPool::takeHandle() {
   curl_easy_setopt(handle, CURLOPT_SSL_VERIFYHOST, 2L);
   curl_easy_setopt(handle, CURLOPT_CAINFO, nullptr);  // the store below instead
   curl_easy_setopt(handle, CURLOPT_CAPATH, nullptr);
+  curl_easy_setopt(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
   curl_easy_setopt(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
   curl_easy_setopt(handle, CURLOPT_SSL_CTX_DATA, &network_);
   curl_easy_setopt(handle, CURLOPT_TCP_NODELAY, 1L);

@@ -1,0 +1,218 @@
+#include <curl/curl.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <set>
+
+#include "tests/linux/url/CurlUrlSessionFixture.h"
+
+namespace kyt {
+namespace {
+
+class CurlURLSessionTLS : public CurlURLSessionFixture {
+ protected:
+  CurlURLSessionTLS() { options_.certificateFile = authority_.file(); }
+  static TestHTTPServer::Options with(TestCertificate certificate, int maximumTLSVersion = 0) {
+    TestHTTPServer::Options options;
+    options.certificate = std::move(certificate);
+    options.maximumTLSVersion = maximumTLSVersion;
+    return options;
+  }
+  TestCertificateAuthority authority_;
+};
+
+TEST_F(CurlURLSessionTLS, TrustsWhatTheAuthoritySigned) {
+  TestHTTPServer server(with(authority_.issue()));
+  auto urls = session();
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(perform(*urls, post(server.url("/"), "secret")).status(), 200);
+  EXPECT_EQ(server.requests()[0].tlsVersion, "TLSv1.3");
+  EXPECT_EQ(server.requests()[0].body, "secret");
+  EXPECT_EQ(server.connectionsAccepted(), 1u);
+}
+
+TEST_F(CurlURLSessionTLS, SpeaksTLS12) {
+  TestHTTPServer server(with(authority_.issue(), 0x0303));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).status(), 200);
+  EXPECT_EQ(server.requests()[0].tlsVersion, "TLSv1.2");
+}
+
+TEST_F(CurlURLSessionTLS, RefusesTLS11) {
+  TestHTTPServer server(with(authority_.issue(), 0x0302));
+  auto urls = session(true);
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_SSL_CONNECT_ERROR);
+  EXPECT_EQ(server.requestCount(), 0u);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesACertificateThatNobodyTrustedSigned) {
+  TestCertificateAuthority stranger;
+  TestHTTPServer server(with(stranger.issue()));
+  auto urls = session();
+  const Outcome outcome = perform(*urls, post(server.url("/"), "secret"));
+  EXPECT_EQ(outcome.errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+  EXPECT_NE(outcome.errorText().find("certificate"), std::string::npos);
+  EXPECT_EQ(server.requestCount(), 0u);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesATestAuthorityByTheSystemsCertificates) {
+  options_.certificateFile.clear();
+  TestHTTPServer server(with(authority_.issue()));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesACertificateForAnotherName) {
+  TestHTTPServer server(with(authority_.issue({"elsewhere.example"})));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesAnExpiredCertificate) {
+  TestHTTPServer server(with(authority_.issue({"localhost", "127.0.0.1"}, true)));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesEverythingWithoutItsCertificateFile) {
+  options_.certificateFile = authority_.folder() + "/missing.pem";
+  TestHTTPServer server(with(authority_.issue()));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_SSL_CACERT_BADFILE);
+  EXPECT_EQ(server.requestCount(), 0u);
+}
+
+TEST_F(CurlURLSessionTLS, TakesUpAReplacedCertificateFile) {
+  TestCertificateAuthority next;
+  TestHTTPServer server(with(next.issue()));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+  std::filesystem::copy_file(next.file(), authority_.folder() + "/next.pem");
+  std::filesystem::rename(authority_.folder() + "/next.pem", authority_.file());
+  const Outcome outcome = perform(*urls, get(server.url("/")));
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+}
+
+TEST_F(CurlURLSessionTLS, FollowsFiveRedirectsThatStayOnHTTPSButNotASixth) {
+  TestHTTPServer server(with(authority_.issue()));
+  server.setHandler([&](const TestHTTPServer::Request& request) {
+    const int left = std::stoi(request.target.substr(1));
+    TestHTTPServer::Reply reply;
+    if (left > 0) {
+      reply.status = 302;
+      reply.headers = {{"Location", server.url("/" + std::to_string(left - 1))}, {"X-On-The-Way", "1"}};
+      reply.body = "elsewhere";
+    } else {
+      reply.headers = {{"X-There", "1"}};
+      reply.body = "arrived";
+    }
+    return reply;
+  });
+  auto urls = session();
+  URLRequest request = get(server.url("/5"));
+  request.maxRedirects = 5;
+  request.headers = {{"If-Modified-Since", "then"}};
+  const Outcome outcome = perform(*urls, request);
+  EXPECT_EQ(outcome.status(), 200);
+  EXPECT_EQ(outcome.body(), "arrived");
+  EXPECT_EQ(outcome.response()->header("X-There"), "1");
+  EXPECT_FALSE(outcome.response()->header("X-On-The-Way"));
+  EXPECT_EQ(server.requestCount(), 6u);
+  request.url = server.url("/6");
+  EXPECT_EQ(perform(*urls, request).errorCode(), CURLE_TOO_MANY_REDIRECTS);
+}
+
+TEST_F(CurlURLSessionTLS, RefusesARedirectThatLeavesHTTPS) {
+  TestHTTPServer plain, server(with(authority_.issue()));
+  server.setReply({.status = 301, .headers = {{"Location", plain.url("/")}}});
+  auto urls = session();
+  URLRequest request = get(server.url("/"));
+  request.maxRedirects = 5;
+  EXPECT_EQ(perform(*urls, request).errorCode(), CURLE_UNSUPPORTED_PROTOCOL);
+  EXPECT_EQ(plain.requestCount(), 0u);
+}
+
+// nginx as a child process that ends with this object.
+class Nginx {
+ public:
+  Nginx(const std::string& folder, const TestCertificate& certificate) : port_(freePort()) {
+    std::ofstream(folder + "/server.pem") << certificate.certificatePEM << certificate.keyPEM;
+    const std::string file = folder + "/nginx.conf", pem = folder + "/server.pem;\n";
+    std::ofstream(file)
+        << "user root;\ndaemon off;\nmaster_process off;\npid " << folder << "/pid;\nerror_log " << folder
+        << "/error.log;\nevents {}\nhttp {\naccess_log off;\nclient_body_temp_path " << folder
+        << "/body;\nproxy_temp_path " << folder << "/p;\nfastcgi_temp_path " << folder
+        << "/f;\nuwsgi_temp_path " << folder << "/u;\nscgi_temp_path " << folder
+        << "/s;\nserver {\nlisten 127.0.0.1:" << port_ << " ssl http2;\nssl_certificate " << pem
+        << "ssl_certificate_key " << pem
+        << "location / { add_header Last-Modified then always; "
+           "return 200 \"$server_protocol $connection $http_x_kyt_source_application\"; }\n}\n}\n";
+    pid_ = fork();
+    if (pid_ == 0) {
+      execl("/usr/sbin/nginx", "nginx", "-c", file.c_str(), "-p", folder.c_str(), nullptr);
+      _exit(127);
+    }
+  }
+  ~Nginx() {
+    kill(pid_, SIGTERM);
+    waitpid(pid_, nullptr, 0);
+  }
+  Nginx(const Nginx&) = delete;
+  Nginx& operator=(const Nginx&) = delete;
+
+  [[nodiscard]] std::string url() const { return "https://127.0.0.1:" + std::to_string(port_) + "/"; }
+  [[nodiscard]] bool listens() const {
+    sockaddr_in address = loopback(port_);
+    const int probe = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    const bool connected = connect(probe, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+    close(probe);
+    return connected;
+  }
+
+ private:
+  static sockaddr_in loopback(uint16_t port) {
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(port);
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    return address;
+  }
+  static uint16_t freePort() {
+    sockaddr_in address = loopback(0);
+    socklen_t size = sizeof address;
+    const int probe = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    (void)bind(probe, reinterpret_cast<sockaddr*>(&address), size);
+    (void)getsockname(probe, reinterpret_cast<sockaddr*>(&address), &size);
+    close(probe);
+    return ntohs(address.sin_port);
+  }
+  uint16_t port_;
+  pid_t pid_ = -1;
+};
+
+TEST_F(CurlURLSessionTLS, SpeaksHTTP2WithARealServerAndSharesOneConnectionInABurst) {
+  if (access("/usr/sbin/nginx", X_OK) != 0) GTEST_SKIP() << "nginx is not installed";
+  const Nginx nginx(authority_.folder(), authority_.issue());
+  ASSERT_TRUE(eventually([&] { return nginx.listens(); }));
+  auto urls = session();
+  std::vector<Outcome> outcomes(30);
+  for (Outcome& outcome : outcomes)
+    urls->start(post(nginx.url(), std::string(8192, 'x')), outcome.completion());
+  std::set<std::string> bodies;
+  for (Outcome& outcome : outcomes) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+    EXPECT_EQ(outcome.response()->header("Last-Modified"), "then");
+    bodies.insert(outcome.body());
+  }
+  ASSERT_EQ(bodies.size(), 1u);  // the same connection's number in each
+  EXPECT_TRUE(bodies.begin()->starts_with("HTTP/2.0 ")) << *bodies.begin();
+  EXPECT_TRUE(bodies.begin()->ends_with(" com.vantu.system.diagnostics"));
+}
+
+}  // namespace
+}  // namespace kyt
