@@ -110,6 +110,10 @@ std::variant<ConfinementProfile, TomlError> parseProfile(std::string_view text, 
   return profile;
 }
 
+bool LandlockConfinement::staysDumpable() {
+  return kSanitized;
+}
+
 std::optional<std::string> LandlockConfinement::enter(std::string_view profileName) {
   const std::string file = folder_ + "/" + std::string(profileName) + ".profile";
   auto text = readTomlText(file);

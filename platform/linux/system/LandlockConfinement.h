@@ -44,6 +44,8 @@ class LandlockConfinement final : public Confinement {
   LandlockConfinement(std::string folder, ProfileVariables variables)
       : folder_(std::move(folder)), variables_(std::move(variables)) {}
   [[nodiscard]] std::optional<std::string> enter(std::string_view profileName) override;
+  // True in builds with a sanitizer.
+  [[nodiscard]] static bool staysDumpable();
 
  private:
   const std::string folder_;

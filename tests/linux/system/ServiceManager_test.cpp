@@ -1,0 +1,203 @@
+#include "platform/linux/system/ServiceManager.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/SerialQueue.h"
+#include "platform/fake/ManualExecutor.h"
+#include "platform/fake/ManualTimers.h"
+#include "tests/support/ChildProcess.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+sockaddr_un addressOf(const std::string& path) {
+  sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+  return address;
+}
+
+// What taking the socket answers in a process that was handed the descriptors 3 … 2+count.
+std::string taken(const std::string& socketPath, int type, bool listens, int count) {
+  return inChildProcess([&]() -> std::string {
+    const int socket = ::socket(AF_UNIX, type, 0);
+    const sockaddr_un address = addressOf(socketPath);
+    if (::bind(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) return "bind";
+    if (listens && ::listen(socket, 5) != 0) return "listen";
+    for (int i = 0; i < count; ++i) {
+      if (socket != 3 + i && ::dup2(socket, 3 + i) < 0) return "dup2";
+    }
+    ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
+    ::setenv("LISTEN_FDS", std::to_string(count).c_str(), 1);
+    auto result = ServiceManager::takeListeningSocket();
+    if (const auto* error = std::get_if<std::string>(&result)) return *error;
+    const auto& handle = std::get<FileHandle>(result);
+    if (::getenv("LISTEN_FDS") != nullptr) return "the environment still tells of it";
+    if (!handle) return "none";
+    if ((::fcntl(handle.get(), F_GETFL) & O_NONBLOCK) == 0) return "blocking";
+    if ((::fcntl(handle.get(), F_GETFD) & FD_CLOEXEC) == 0) return "inherited";
+    auto again = ServiceManager::takeListeningSocket();
+    return std::get<FileHandle>(again) ? "twice" : "taken";
+  });
+}
+
+TEST(ServiceManager, AdoptsTheOneListeningSocket) {
+  const TemporaryFolder folder;
+  EXPECT_EQ(taken(folder / "1", SOCK_STREAM, true, 1), "taken");
+  EXPECT_EQ(taken(folder / "2", SOCK_STREAM, true, 2), "LISTEN_FDS: more than one socket was handed over");
+  EXPECT_EQ(taken(folder / "3", SOCK_STREAM, false, 1),
+            "LISTEN_FDS: what was handed over is no listening Unix stream socket");
+  EXPECT_EQ(taken(folder / "4", SOCK_DGRAM, false, 1),
+            "LISTEN_FDS: what was handed over is no listening Unix stream socket");
+}
+
+TEST(ServiceManager, WithoutActivationThereIsNoSocket) {
+  EXPECT_EQ(inChildProcess([]() -> std::string {
+              ::unsetenv("LISTEN_FDS");
+              ::unsetenv("LISTEN_PID");
+              auto result = ServiceManager::takeListeningSocket();
+              return std::holds_alternative<FileHandle>(result) && !std::get<FileHandle>(result) ? "none"
+                                                                                                 : "some";
+            }),
+            "none");
+}
+
+TEST(ServiceManager, TellsItsStateWhenSomeoneListens) {
+  const TemporaryFolder folder;
+  EXPECT_EQ(inChildProcess([&]() -> std::string {
+              ::unsetenv("NOTIFY_SOCKET");
+              ServiceManager::ready("nobody listens");
+              const FileHandle socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+              const sockaddr_un address = addressOf(folder / "notify");
+              if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+                return "bind";
+              ::setenv("NOTIFY_SOCKET", address.sun_path, 1);
+              ServiceManager::ready("Listening");
+              ServiceManager::status("5 sessions\nREADY=0");
+              ServiceManager::stopping();
+              std::string all;
+              for (int i = 0; i < 3; ++i) {
+                char buffer[512];
+                const ssize_t count = ::recv(socket.get(), buffer, sizeof buffer, 0);
+                all += std::string(buffer, static_cast<size_t>(count > 0 ? count : 0)) + "|";
+              }
+              return all;
+            }),
+            "READY=1\nSTATUS=Listening|STATUS=5 sessions\\nREADY=0|STOPPING=1\nSTATUS=Stopping|");
+}
+
+TEST(ServiceClass, UtilityGivesWayToOthers) {
+  EXPECT_EQ(inChildProcess([]() -> std::string {
+              const int before = ::getpriority(PRIO_PROCESS, 0);
+              if (!enterUtilityServiceClass()) return "refused";
+              const int after = ::getpriority(PRIO_PROCESS, 0);
+              const long io = ::syscall(SYS_ioprio_get, 1, 0);
+              if (after != std::max(before, 5)) return "nice " + std::to_string(after);
+              if (io != (2 << 13 | 6)) return "ioprio " + std::to_string(io);
+              if (::setpriority(PRIO_PROCESS, 0, 12) != 0 || !enterUtilityServiceClass())
+                return "refused again";
+              return ::getpriority(PRIO_PROCESS, 0) == 12 ? "" : "made more important";
+            }),
+            "");
+}
+
+class LinuxProcessTransactionTest : public testing::Test {
+ protected:
+  std::unique_ptr<LinuxProcessTransaction> make(bool socketActivated) {
+    return std::make_unique<LinuxProcessTransaction>(LinuxProcessTransaction::Options{socketActivated, 30},
+                                                     timers_, queue_, [this] {
+                                                       ++asked_;
+                                                       return mayEnd_;
+                                                     });
+  }
+  void advance(int seconds) {
+    timers_.advance(std::chrono::seconds(seconds), [this] { executor_.runAll(); });
+  }
+  ManualClock clock_;
+  ManualTimers timers_{clock_};
+  ManualExecutor executor_;
+  std::shared_ptr<SerialQueue> queue_ = SerialQueue::create("test", executor_);
+  bool mayEnd_ = true;
+  int asked_ = 0;
+};
+
+TEST_F(LinuxProcessTransactionTest, EndsAnIdleProcessThatNobodyConnectedTo) {
+  const auto transaction = make(true);
+  advance(29);
+  EXPECT_EQ(asked_, 0);
+  advance(1);
+  EXPECT_EQ(asked_, 1);
+  advance(100);
+  EXPECT_EQ(asked_, 1);
+}
+
+TEST_F(LinuxProcessTransactionTest, AnOpenTransactionKeepsTheProcess) {
+  const auto transaction = make(true);
+  advance(29);
+  transaction->begin();
+  EXPECT_TRUE(transaction->isOpen());
+  EXPECT_EQ(timers_.pending(), 0u) << "no wake-ups meanwhile";
+  advance(1000);
+  EXPECT_EQ(asked_, 0);
+  transaction->end();
+  EXPECT_FALSE(transaction->isOpen());
+  advance(29);
+  EXPECT_EQ(asked_, 0) << "counted from the end of the last session";
+  advance(1);
+  EXPECT_EQ(asked_, 1);
+}
+
+TEST_F(LinuxProcessTransactionTest, OutstandingWorkBeginsTheWaitAnew) {
+  mayEnd_ = false;
+  const auto transaction = make(true);
+  advance(30);
+  EXPECT_EQ(asked_, 1);
+  advance(29);
+  EXPECT_EQ(asked_, 1);
+  mayEnd_ = true;
+  advance(1);
+  EXPECT_EQ(asked_, 2);
+  advance(1000);
+  EXPECT_EQ(asked_, 2);
+}
+
+TEST_F(LinuxProcessTransactionTest, ABeginThatOvertakesTheTimersWorkWins) {
+  const auto transaction = make(true);
+  timers_.advance(std::chrono::seconds(30));  // due, handed to the queue, not run yet
+  transaction->begin();
+  executor_.runAll();
+  EXPECT_EQ(asked_, 0);
+  transaction->end();
+  executor_.runAll();
+  EXPECT_EQ(asked_, 0);
+}
+
+TEST_F(LinuxProcessTransactionTest, WithoutSocketActivationNothingEnds) {
+  const auto transaction = make(false);
+  transaction->begin();
+  transaction->end();
+  EXPECT_EQ(timers_.pending(), 0u);
+  advance(1000);
+  EXPECT_EQ(asked_, 0);
+}
+
+TEST_F(LinuxProcessTransactionTest, MayEndWhileItsWorkIsOnItsWay) {
+  auto transaction = make(true);
+  timers_.advance(std::chrono::seconds(30));
+  transaction.reset();
+  executor_.runAll();
+  EXPECT_EQ(asked_, 0);
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,53 @@
+#include "platform/linux/system/TomlBundle.h"
+
+#include <gtest/gtest.h>
+
+#include "platform/fake/MemoryLogSink.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+TEST(TomlBundle, HoldsItsVersionAndResources) {
+  const TemporaryFolder folder;
+  MemoryLogSink sink;
+  Log log(sink);
+  folder.write("info.toml", "version = \"8.0\"\n");
+  folder.write("publicKey.der", std::string("\x30\x00\xff", 3));
+  TomlBundle bundle(folder.path(), log);
+  std::filesystem::remove_all(folder.path());
+  EXPECT_EQ(bundle.version(), String("8.0"));
+  ASSERT_TRUE(bundle.resource("publicKey", "der"));
+  EXPECT_EQ(bundle.resource("publicKey", "der")->view(), std::string_view("\x30\x00\xff", 3));
+  EXPECT_EQ(bundle.resource("publicKey", "pem"), std::nullopt);
+  EXPECT_EQ(bundle.resource("../publicKey", "der"), std::nullopt);
+  EXPECT_TRUE(sink.lines().empty());
+}
+
+TEST(TomlBundle, WithoutItsInformationHasNoVersion) {
+  const TemporaryFolder folder;
+  MemoryLogSink sink;
+  Log log(sink);
+  EXPECT_EQ(TomlBundle(folder / "none", log).version(), std::nullopt);
+  EXPECT_EQ(sink.count(LogLevel::error, "bundle: " + (folder / "none/info.toml") + ": No such file"), 1u);
+  folder.write("info.toml", "version = 8\n");
+  EXPECT_EQ(TomlBundle(folder.path(), log).version(), std::nullopt);
+  EXPECT_EQ(sink.count("\"version\" must be text"), 1u);
+  folder.write("info.toml", "version = \n");
+  folder.write("large.bin", std::string(TomlBundle::kMaxResourceBytes + 1, 'x'));
+  TomlBundle bundle(folder.path(), log);
+  EXPECT_EQ(bundle.version(), std::nullopt);
+  EXPECT_EQ(bundle.resource("large", "bin"), std::nullopt);
+  EXPECT_EQ(sink.count("is too large"), 1u);
+}
+
+TEST(TomlBundle, TheShippedOnesAreOfThisVersion) {
+  MemoryLogSink sink;
+  Log log(sink);
+  EXPECT_EQ(TomlBundle(KYT_PACKAGING_SHARE "/KYTReporting.bundle", log).version(), String("8.0"));
+  EXPECT_EQ(TomlBundle(KYT_PACKAGING_SHARE "/kytreportingd.bundle", log).version(), String("8.0"));
+  EXPECT_TRUE(sink.lines().empty());
+}
+
+}  // namespace
+}  // namespace kyt

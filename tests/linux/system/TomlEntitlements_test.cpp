@@ -1,0 +1,245 @@
+#include "platform/linux/system/TomlEntitlements.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "platform/Keys.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+constexpr char kGranted[] = "\"com.vantu.private.kytreportingd\" = true\n";
+
+Descriptor pidfdOf(pid_t pid) {
+  return Descriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)), [](int fd) { ::close(fd); });
+}
+
+class TomlEntitlementsTest : public testing::Test {
+ protected:
+  TomlEntitlementsTest() { ::chmod(folder_.path().c_str(), 0755); }
+  static PeerCredentials peer(uint32_t uid, uint32_t gid = 77) {
+    PeerCredentials result;
+    result.pid = ::getpid();
+    result.uid = uid;
+    result.gid = gid;
+    return result;
+  }
+  void grant(const std::string& criteria, const std::string& name = "a.toml") {
+    folder_.write(name, "[[grant]]\n" + criteria + kGranted);
+  }
+  Value value(const PeerCredentials& credentials) {
+    return entitlements_.valueFor(credentials, kEntitlement);
+  }
+  bool isGranted(const PeerCredentials& credentials) { return value(credentials).boolValue(); }
+
+  TemporaryFolder folder_;
+  MemoryLogSink sink_;
+  Log log_{sink_};
+  Counters counters_;
+  DirectProgramInspector inspector_;
+  TomlEntitlements entitlements_{{folder_.path(), ::geteuid()}, inspector_, log_, counters_};
+};
+
+TEST_F(TomlEntitlementsTest, NobodyIsGrantedAnythingWithoutFiles) {
+  EXPECT_TRUE(value(peer(0)).isNull());
+  EXPECT_TRUE(sink_.lines().empty());
+  TomlEntitlements elsewhere({folder_ / "none", ::geteuid()}, inspector_, log_, counters_);
+  EXPECT_TRUE(elsewhere.valueFor(peer(0), kEntitlement).isNull());
+}
+
+TEST_F(TomlEntitlementsTest, MatchesByUser) {
+  grant("user = 1234\n");
+  EXPECT_EQ(value(peer(1234)).boolean(), true);
+  EXPECT_FALSE(isGranted(peer(1235)));
+  EXPECT_TRUE(entitlements_.valueFor(peer(1234), "com.vantu.other").isNull());
+  grant("user = \"root\"\n");
+  EXPECT_TRUE(isGranted(peer(0)));
+  EXPECT_FALSE(isGranted(peer(1234)));
+  grant("user = \"nobody-of-that-name\"\n");
+  EXPECT_FALSE(isGranted(peer(0)));
+  grant("user = 4294967296\n");
+  EXPECT_FALSE(isGranted(peer(0))) << "a number that does not fit is nobody";
+}
+
+TEST_F(TomlEntitlementsTest, MatchesByGroupAndSupplementaryGroup) {
+  grant("group = 55\n");
+  EXPECT_TRUE(isGranted(peer(1, 55)));
+  PeerCredentials member = peer(1, 2);
+  EXPECT_FALSE(isGranted(member));
+  member.groups = {54, 55};
+  EXPECT_TRUE(isGranted(member));
+  grant("group = \"root\"\n");
+  EXPECT_TRUE(isGranted(peer(1, 0)));
+}
+
+TEST_F(TomlEntitlementsTest, MatchesBySecurityLabel) {
+  grant("security_label = \"app (enforce)\"\n");
+  PeerCredentials labelled = peer(1);
+  EXPECT_FALSE(isGranted(labelled));
+  labelled.securityLabel = "app (enforce)";
+  EXPECT_TRUE(isGranted(labelled));
+}
+
+TEST_F(TomlEntitlementsTest, AllCriteriaOfAGrantMustMatch) {
+  grant("user = 5\ngroup = 6\n");
+  EXPECT_TRUE(isGranted(peer(5, 6)));
+  EXPECT_FALSE(isGranted(peer(5, 7)));
+  EXPECT_FALSE(isGranted(peer(4, 6)));
+}
+
+TEST_F(TomlEntitlementsTest, AnyMatchingGrantSuffices) {
+  folder_.write("a.toml", "[[grant]]\nuser = 5\n\"com.vantu.private.kytreportingd\" = false\n");
+  EXPECT_EQ(value(peer(5)).boolean(), false);
+  grant("group = 6\n", "b.toml");
+  EXPECT_TRUE(isGranted(peer(5, 6)));
+  EXPECT_FALSE(isGranted(peer(5, 7)));
+}
+
+TEST_F(TomlEntitlementsTest, ChangedAddedAndRemovedFilesCountForTheNextConnection) {
+  for (uint32_t i = 100; i < 150; ++i) {  // in place, same size, often within one tick of the kernel's clock
+    grant("user = " + std::to_string(i) + "\n");
+    ASSERT_TRUE(isGranted(peer(i)));
+    ASSERT_FALSE(isGranted(peer(i - 1)));
+  }
+  grant("user = 7\n", "b.toml");
+  EXPECT_TRUE(isGranted(peer(7)));
+  ::unlink((folder_ / "b.toml").c_str());
+  EXPECT_FALSE(isGranted(peer(7)));
+  grant("user = 7\n", "c.toml.bak");
+  grant("user = 7\n", ".c.toml");
+  EXPECT_FALSE(isGranted(peer(7)));
+}
+
+TEST_F(TomlEntitlementsTest, AFileThatOthersCanWriteIsIgnoredWithALine) {
+  for (mode_t mode : {0664, 0646, 0666}) {
+    sink_.clear();
+    folder_.write("a.toml", std::string("[[grant]]\nuser = 5\n") + kGranted, mode);
+    EXPECT_FALSE(isGranted(peer(5)));
+    EXPECT_FALSE(isGranted(peer(5)));
+    EXPECT_EQ(sink_.count(LogLevel::error,
+                          "entitlements: " + (folder_ / "a.toml") + ": others than root can write the file"),
+              1u);
+  }
+  EXPECT_EQ(counters_.value(Reason::badEntitlementsFile), 3u);
+  ::chmod((folder_ / "a.toml").c_str(), 0644);
+  EXPECT_TRUE(isGranted(peer(5)));
+}
+
+TEST_F(TomlEntitlementsTest, AFileOfAnotherOwnerIsIgnored) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  grant("user = 5\n");
+  ASSERT_EQ(::chown((folder_ / "a.toml").c_str(), 1234, 0), 0);
+  EXPECT_FALSE(isGranted(peer(5)));
+  EXPECT_EQ(sink_.count("others than root can write the file"), 1u);
+  TomlEntitlements trusting({folder_.path(), 1234}, inspector_, log_, counters_);
+  EXPECT_TRUE(trusting.valueFor(peer(5), kEntitlement).boolValue())
+      << "the user of a private root may own its files";
+}
+
+TEST_F(TomlEntitlementsTest, WhatIsWrongCountsForNothingAndIsToldOnce) {
+  const std::pair<std::string, std::string> bad[] = {
+      {kGranted, ":1: a grant without user, group, executable and security_label is ignored"},
+      {"usre = 5\nuser = 5\n", ":2: \"usre\" is unknown. The grant is ignored"},
+      {"user = true\n", ":2: \"user\" must be a name or a number. The grant is ignored"},
+      {"user = -1\n", ":2: \"user\" must be a name or a number. The grant is ignored"},
+      {"user = 5\nexecutable = \"bin/x\"\n",
+       ":3: \"executable\" must be an absolute path. The grant is ignored"},
+      {"user = 5\nsecurity_label = \"\"\n", ":3: \"security_label\" must be text. The grant is ignored"},
+      {"user = 5\ncom.vantu.x = true\n",
+       ":3: \"com\" must be a value (the name of an entitlement stands in quotes). The "
+       "grant is ignored"},
+      {"user = 5\n\"com.vantu.x\" = [1]\n",
+       ":3: \"com.vantu.x\" must be text, a boolean or a number. The grant is ignored"},
+  };
+  for (const auto& [lines, message] : bad) {
+    sink_.clear();
+    folder_.write("a.toml", "[[grant]]\n" + lines + (lines == kGranted ? "" : kGranted) +
+                                "[[grant]]\nuser = 6\n" + kGranted);
+    EXPECT_FALSE(isGranted(peer(5))) << lines;
+    EXPECT_TRUE(isGranted(peer(6))) << "the other grant of the file counts: " << lines;
+    EXPECT_EQ(sink_.lines().size(), 1u) << lines;
+    EXPECT_TRUE(sink_.contains(LogLevel::error, "entitlements: " + (folder_ / "a.toml") + message)) << lines;
+  }
+  for (const char* text : {"[[grant]\n", "grants = 1\n", "[grant]\nuser = 5\n", "grant = [5]\n"}) {
+    sink_.clear();
+    folder_.write("a.toml", text);
+    EXPECT_FALSE(isGranted(peer(5))) << text;
+    EXPECT_EQ(sink_.lines().size(), 1u) << text;
+  }
+}
+
+TEST_F(TomlEntitlementsTest, MatchesByTheRunningProgram) {
+  std::string own = std::filesystem::read_symlink("/proc/self/exe");
+  grant("executable = \"" + own + "\"\n");
+  PeerCredentials self = peer(1);
+  EXPECT_FALSE(isGranted(self)) << "without a pidfd nothing is known";
+  EXPECT_FALSE(isGranted(self));
+  EXPECT_EQ(sink_.count(LogLevel::error, "entitlements: Grants by executable cannot match: the kernel"), 1u);
+  self.pidfd = pidfdOf(::getpid());
+  EXPECT_TRUE(isGranted(self));
+  std::filesystem::create_symlink(own, folder_ / "link");
+  grant("executable = \"" + (folder_ / "link") + "\"\n");
+  EXPECT_TRUE(isGranted(self)) << "the file counts, not its name";
+  std::filesystem::copy_file("/bin/true", folder_ / "other");
+  grant("executable = \"" + (folder_ / "other") + "\"\n");
+  EXPECT_FALSE(isGranted(self));
+  grant("executable = \"" + (folder_ / "missing") + "\"\n");
+  EXPECT_FALSE(isGranted(self));
+}
+
+TEST_F(TomlEntitlementsTest, AProcessThatHasEndedIsNobody) {
+  grant("executable = \"" + std::filesystem::read_symlink("/proc/self/exe").string() + "\"\n");
+  const pid_t child = ::fork();
+  if (child == 0) {
+    while (true) ::pause();
+  }
+  PeerCredentials ended = peer(1);
+  ended.pid = child;
+  ended.pidfd = pidfdOf(child);
+  EXPECT_TRUE(isGranted(ended));
+  ::kill(child, SIGKILL);
+  siginfo_t info = {};
+  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child), &info, WEXITED | WNOWAIT), 0);
+  EXPECT_FALSE(isGranted(ended));  // its number still stands for it, but it runs nothing
+  ASSERT_EQ(::waitpid(child, nullptr, 0), child);
+  EXPECT_FALSE(isGranted(ended));
+  ended.pid = ::getpid();  // as if another process had its number now
+  EXPECT_FALSE(isGranted(ended));
+  EXPECT_TRUE(sink_.lines().empty()) << "an ended process is no lack of privilege";
+}
+
+class RefusingInspector final : public ProgramInspector {
+ public:
+  std::variant<ProgramIdentity, int> runningProgram(int32_t) override { return EACCES; }
+};
+
+TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatIsToldOnce) {
+  RefusingInspector refusing;
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_);
+  grant("executable = \"/proc/self/exe\"\n");
+  PeerCredentials self = peer(1);
+  self.pidfd = pidfdOf(::getpid());
+  for (int i = 0; i < 3; ++i) EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
+  EXPECT_EQ(
+      sink_.count(LogLevel::error, "entitlements: Grants by executable cannot match: Permission denied"), 1u);
+}
+
+TEST(ProgramInspectorProcess, AnswersLikeAskingDirectly) {
+  auto started = ProgramInspectorProcess::start();
+  ASSERT_EQ(started.index(), 0u);
+  ProgramInspector& inspector = *std::get<0>(started);
+  DirectProgramInspector direct;
+  EXPECT_EQ(inspector.runningProgram(::getpid()), direct.runningProgram(::getpid()));
+  EXPECT_EQ(std::get<int>(inspector.runningProgram(0)), ESRCH);
+  EXPECT_EQ(std::get<int>(inspector.runningProgram(-5)), ESRCH);
+  EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ENOENT);
+}
+
+}  // namespace
+}  // namespace kyt
