@@ -54,8 +54,8 @@ const char* deflateErrorText(int code) {
   }
 }
 
-const char* messageText(const DeflateStream& stream) {
-  const char* message = stream.message();
+const char* messageText(const DeflateStream* stream) {
+  const char* message = stream != nullptr ? stream->message() : nullptr;
   return message != nullptr ? message : "(null)";
 }
 
@@ -67,10 +67,12 @@ std::optional<Data> compressDataWithZlibOrGzip(Platform& platform, bool gzip, By
     return std::nullopt;
   }
   const std::unique_ptr<DeflateStream> stream = platform.deflate.newStream();
-  int code = stream->initialize(kDefaultLevel, gzip ? kGzipWindowBits : kZlibWindowBits, kMemoryLevel);
+  int code = kMemoryError;
+  if (stream != nullptr)
+    code = stream->initialize(kDefaultLevel, gzip ? kGzipWindowBits : kZlibWindowBits, kMemoryLevel);
   if (code != kOK) {
     platform.log.error("compressDataWithZlibOrGzip: deflateInit2() Error: \"%s\" Message: \"%s\"",
-                       initializationErrorText(code), messageText(*stream));
+                       initializationErrorText(code), messageText(stream.get()));
     return std::nullopt;
   }
   std::byte* buffer = nullptr;
@@ -83,7 +85,7 @@ std::optional<Data> compressDataWithZlibOrGzip(Platform& platform, bool gzip, By
   if (code != kStreamEnd) {
     platform.log.error(
         "compressDataWithZlibOrGzip: zlib error while attempting compression: \"%s\" Message: \"%s\"",
-        deflateErrorText(code), messageText(*stream));
+        deflateErrorText(code), messageText(stream.get()));
     stream->end();
     return std::nullopt;
   }

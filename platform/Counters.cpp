@@ -38,6 +38,8 @@ const char* reasonName(Reason reason) {
       return "batched-event-filtered";
     case Reason::postWithoutURL:
       return "post-without-url";
+    case Reason::postWithoutPoster:
+      return "post-without-poster";
     case Reason::postFailed:
       return "post-failed";
     case Reason::postRefused:

@@ -30,6 +30,7 @@ enum class Reason : uint8_t {
   batchDiscarded,            // records discarded with a batch whose back end is not enabled
   batchedEventFiltered,      // records rejected by the lists at a flush
   postWithoutURL,
+  postWithoutPoster,         // a request whose session was gone: nothing was sent
   postFailed,                // a request ended with a transport error; its events are lost
   postRefused,               // a server answered 4xx or 5xx
   waitingRequestDisplaced,   // a request dropped while waiting for connectivity

@@ -109,8 +109,8 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
   Dictionary entries;
   entries.reserve(3);
   entries.append("postTime", finiteOrMinusOne(platform_.clock.timeOfDay().asSeconds()));
-  // A missing client ID cuts the message short, deliberately: nothing is posted that no one could be told
-  // apart by.
+  // Deliberately a list that ends at the first missing object: servers know that events never come without
+  // a client ID, and that such a message carries its time alone.
   if (const std::optional<String> client = clientID()) {
     entries.append("clientId", *client);
     entries.append("events", Value(std::move(records)));
@@ -194,7 +194,10 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
   URLRequest request = newRequest(addressWithForcedScheme(*url), std::move(json), method, responseCode);
   const auto delegate = connectivityDelegate();
   // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
-  if (delegate == nullptr) return;
+  if (delegate == nullptr) {
+    platform_.counters.add(Reason::postWithoutPoster);
+    return;
+  }
   delegate->postURLRequestWithCompletionHandler(
       std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion)});
 }

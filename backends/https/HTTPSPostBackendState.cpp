@@ -195,6 +195,8 @@ bool HTTPSPostBackend::passesConsent(const Dictionary& entry) {
 
 bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* country) const {
   Log& log = platform_.log;
+  // The list is required, so it is matched by the rule that fails without one. By the same rule a device
+  // whose country is not known passes: deliberate, servers count on hearing from those.
   const Array* locales = arrayEntry(entry, "locale_whitelist");
   if (!matchStringWithList(locales, country, false)) {
     if (log.debugEnabled())

@@ -15,6 +15,7 @@
 #include "platform/fake/FakeDeviceProperties.h"
 #include "platform/fake/FakeUrlSession.h"
 #include "platform/fake/FakeUserDefaults.h"
+#include "platform/fake/FaultyDeflate.h"
 #include "platform/fake/FixedRandom.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
@@ -43,7 +44,8 @@ struct TestPlatform {
   OpenSSLCryptography cryptography;
   PugixmlPropertyLists propertyLists;
   RapidJSONWriter json;
-  ZlibDeflate deflate;
+  ZlibDeflate zlib;
+  FaultyDeflate deflate{&zlib};
   LinuxMemoryInfo memory;
   FakeURLSessionFactory urlSessions;
   FakeBundle clientBundle, daemonBundle;

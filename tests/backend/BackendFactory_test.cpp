@@ -1,0 +1,193 @@
+// The factory, with classes of its own; which concrete class stands under which name is BackendTable's test.
+#include "backend/BackendFactory.h"
+
+#include <gtest/gtest.h>
+
+#include "platform/Keys.h"
+#include "tests/support/TestPlatform.h"
+
+namespace kyt {
+namespace {
+
+constexpr char kNilTable[] = "createBackends: Attempted to create backends with nil storebag";
+constexpr char kNilInfo[] = "createBackends: Attempted to create backends with nil session info";
+
+class BackendFactoryTest : public testing::Test {
+ protected:
+  struct Made {
+    std::string creator;
+    std::optional<String> productFamily;
+    int32_t clientType;
+  };
+
+  BackendCreator creator(const char* name, const char* label) {
+    return {name, [this, label](const String& n, const Dictionary& profile,
+                                const std::optional<String>& family, int32_t clientType) {
+              made_.push_back({label, family, clientType});
+              return KYTReportingBackend::initWithName(platform_.platform, n, profile, family);
+            }};
+  }
+  DefaultBackendFactory factory() {
+    return {platform_.configuration,
+            {creator(kKYTReportingBackendDashboard, "first"),
+             creator(kKYTReportingBackendDashboard, "second"),
+             creator(kKYTReportingBackendQDX, "qdx"),
+             {"failing", [](const auto&...) { return std::shared_ptr<KYTReportingBackend>(); }}}};
+  }
+  std::optional<Backends> create(const std::optional<Dictionary>& table,
+                                 const std::optional<Dictionary>& info,
+                                 const std::optional<Dictionary>& userInfo = std::nullopt) {
+    return factory().createBackends(table, info, userInfo, "device");
+  }
+  size_t errorLines() const {
+    size_t lines = 0;
+    for (const auto& line : platform_.sink.lines()) lines += line.level == LogLevel::error;
+    return lines;
+  }
+
+  TestPlatform platform_;
+  std::vector<Made> made_;
+};
+
+TEST_F(BackendFactoryTest, AMissingTableYieldsNothingAndOneLine) {
+  EXPECT_FALSE(create(std::nullopt, std::nullopt));
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::error, kNilTable));
+  EXPECT_EQ(errorLines(), 1u);
+}
+
+TEST_F(BackendFactoryTest, MissingSessionInformationYieldsNothingAndOneLine) {
+  EXPECT_FALSE(create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}}, std::nullopt));
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::error, kNilInfo));
+  EXPECT_TRUE(made_.empty());
+}
+
+TEST_F(BackendFactoryTest, AnEmptyTableYieldsAnEmptySet) {
+  const std::optional<Backends> backends = create(Dictionary{}, Dictionary{});
+  ASSERT_TRUE(backends);
+  EXPECT_TRUE(backends->empty());
+  EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST_F(BackendFactoryTest, TheFirstRowOfANameDecides) {
+  const std::optional<Backends> backends =
+      create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{{"k", 1}}}}, Dictionary{});
+  ASSERT_TRUE(backends);
+  ASSERT_EQ(made_.size(), 1u);
+  EXPECT_EQ(made_[0].creator, "first");
+  EXPECT_EQ(backends->find(kKYTReportingBackendDashboard)->profile(), (Dictionary{{"k", 1}}));
+}
+
+TEST_F(BackendFactoryTest, AnUnknownNameIsLoggedAndTheOthersAreMade) {
+  const std::optional<Backends> backends = create(
+      Dictionary{{"telegraph", Dictionary{}}, {kKYTReportingBackendDashboard, Dictionary{}}}, Dictionary{});
+  ASSERT_TRUE(backends);
+  EXPECT_EQ(backends->size(), 1u);
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, "KYTReportingBackend(newBackendWithName): telegraph"), 1u);
+}
+
+TEST_F(BackendFactoryTest, ANameWhoseClassIsNotThereIsUnknown) {
+  DefaultBackendFactory none(platform_.configuration, {});
+  EXPECT_EQ(none.newBackendWithName(kKYTReportingBackendHTTPPost, {}, std::nullopt, 7), nullptr);
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::error, "KYTReportingBackend(newBackendWithName): httppost"));
+}
+
+TEST_F(BackendFactoryTest, AnInitialiserThatFailsIsSkippedWithoutALine) {
+  const std::optional<Backends> backends = create(Dictionary{{"failing", Dictionary{}}}, Dictionary{});
+  ASSERT_TRUE(backends);
+  EXPECT_TRUE(backends->empty());
+  EXPECT_EQ(errorLines(), 0u);
+}
+
+TEST_F(BackendFactoryTest, ADesktopDeviceHasNoQDX) {
+  platform_.deviceProperties.setProperty("ProductType", "Desktop");
+  EXPECT_TRUE(create(Dictionary{{kKYTReportingBackendQDX, Dictionary{}}}, Dictionary{})->empty());
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, "KYTReportingBackend(newBackendWithName): qdx"), 1u);
+  EXPECT_TRUE(made_.empty());
+}
+
+TEST_F(BackendFactoryTest, AnyOtherDeviceHasQDX) {
+  const Dictionary info{{kKYTReportingSessionInfoClientType, 7}};
+  EXPECT_EQ(create(Dictionary{{kKYTReportingBackendQDX, Dictionary{}}}, info)->size(), 1u);
+  ASSERT_EQ(made_.size(), 1u);
+  EXPECT_EQ(made_[0].clientType, 7);
+}
+
+TEST_F(BackendFactoryTest, ADeviceOfUnknownTypeHasQDX) {
+  platform_.deviceProperties.removeProperty("ProductType");
+  EXPECT_EQ(create(Dictionary{{kKYTReportingBackendQDX, Dictionary{}}}, Dictionary{})->size(), 1u);
+}
+
+TEST_F(BackendFactoryTest, StampsSessionDeviceAndVersionOnEveryBackEnd) {
+  platform_.deviceProperties.setProperty("ProductVersion", "17.1");
+  platform_.deviceProperties.setProperty("BuildVersion", "21B74");
+  platform_.deviceProperties.setProperty("ProductType", "Phone9,1");
+  platform_.deviceProperties.setProperty("DeviceName", "Phone");
+  platform_.deviceProperties.setProperty("ReleaseType", "Internal");
+  platform_.daemonBundle.setVersion("9.1.2");
+  platform_.clock.setTimeOfDay({100, 500000});
+  const Dictionary info{{kKYTReportingSessionInfoSessionID, 4294967295u},
+                        {kKYTReportingSessionInfoClientType, 11},
+                        {kKYTReportingSessionInfoClientVersion, 65537},
+                        {kKYTReportingSessionInfoRequireUserInfo, true},
+                        {kKYTReportingSessionInfoBatchEvent, "yes"}};
+  const Dictionary userInfo{{kKYTReportingUserInfoClientName, "a"}};
+  const std::optional<Backends> backends = create(
+      Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}, {kKYTReportingBackendQDX, Dictionary{}}},
+      info, userInfo);
+  ASSERT_TRUE(backends);
+  ASSERT_EQ(backends->size(), 2u);
+  for (const auto& [name, backend] : *backends) {
+    EXPECT_EQ(backend->name(), name);
+    EXPECT_EQ(backend->sessionID(), 4294967295u);
+    EXPECT_EQ(backend->compType(), 11);
+    EXPECT_EQ(backend->clientVersion(), 1);
+    EXPECT_STREQ(backend->udid(), "device");
+    EXPECT_EQ(backend->productVersion(), String("17.1"));
+    EXPECT_EQ(backend->buildVersion(), String("21B74"));
+    EXPECT_EQ(backend->hardwareType(), String("Phone9,1"));
+    EXPECT_EQ(backend->productFamily(), String("Phone"));
+    EXPECT_TRUE(backend->isInternal());
+    EXPECT_TRUE(backend->requireUserInfo());
+    EXPECT_TRUE(backend->batchEvents());
+    EXPECT_EQ(backend->userInfoDict(), userInfo);
+    EXPECT_EQ(backend->selfVersionMajor(), 9);
+    EXPECT_EQ(backend->selfVersionMiddle(), 1);
+    EXPECT_EQ(backend->selfVersionMinor(), 2);
+    EXPECT_EQ(backend->startTimeStamp(), 100.5);
+    EXPECT_EQ(backend->state(), kBackendStateUndecided);
+    EXPECT_EQ(backend.use_count(), 1);
+  }
+}
+
+TEST_F(BackendFactoryTest, WhatTheSessionInformationLacksReadsAsZero) {
+  const auto backends = create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}}, Dictionary{});
+  const KYTReportingBackend& backend = *backends->find(kKYTReportingBackendDashboard);
+  EXPECT_EQ(backend.sessionID(), 0u);
+  EXPECT_EQ(backend.compType(), 0);
+  EXPECT_EQ(backend.clientVersion(), 0);
+  EXPECT_FALSE(backend.requireUserInfo());
+  EXPECT_FALSE(backend.batchEvents());
+  EXPECT_FALSE(backend.userInfoDict());
+}
+
+TEST_F(BackendFactoryTest, ADaemonWithoutAVersionIs8) {
+  platform_.daemonBundle.setVersion(std::nullopt);
+  const auto backends = create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}}, Dictionary{});
+  const KYTReportingBackend& backend = *backends->find(kKYTReportingBackendDashboard);
+  EXPECT_EQ(backend.selfVersionMajor(), 8);
+  EXPECT_EQ(backend.selfVersionMiddle(), 0);
+  EXPECT_EQ(backend.selfVersionMinor(), 0);
+}
+
+TEST_F(BackendFactoryTest, KeepsTheOrderOfTheTable) {
+  const auto backends = create(
+      Dictionary{{kKYTReportingBackendQDX, Dictionary{}}, {kKYTReportingBackendDashboard, Dictionary{}}},
+      Dictionary{});
+  std::vector<std::string> names;
+  for (const auto& [name, backend] : *backends) names.push_back(name.str());
+  EXPECT_EQ(names, (std::vector<std::string>{"qdx", "dashboard"}));
+  EXPECT_EQ(backends->find("httppost"), nullptr);
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,384 @@
+// The road of one event by state and flag, the batch and its flush.
+#include "platform/ObjectSize.h"
+#include "tests/backends/https/HTTPSFixture.h"
+
+namespace kyt {
+namespace {
+
+class HTTPSPostBackendBatch : public HTTPSFixture {
+ protected:
+  HTTPSPostBackend& inState(int32_t state) {
+    decided();
+    backend().setState(state);
+    return backend();
+  }
+  FlushAnswer flush() {
+    FlushAnswer answer;
+    backend().flushMessagesWithCompletion(answer.completion());
+    return answer;
+  }
+  // Flushes, answers the request, and says how many records it had.
+  size_t postedRecords() {
+    const size_t before = poster_->requests.size();
+    backend().flushMessagesWithCompletion(nullptr);
+    return poster_->requests.size() == before ? 0 : events(before).size();
+  }
+  bool logged(const char* text) const { return platform_.sink.contains(LogLevel::debug, text); }
+};
+
+TEST_F(HTTPSPostBackendBatch, ADisabledBackEndDropsEvents) {
+  inState(kBackendStateDisabled);
+  EXPECT_TRUE(send(5, {}, 3).isNull());
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_EQ(backend().batchedEventsSize(), 0u);
+  EXPECT_EQ(dropped(Reason::eventDroppedByState), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AnUndecidedBackEndBatchesWhateverTheFlag) {
+  backend();
+  for (const int32_t flag : {0, 1, 2, 3}) EXPECT_TRUE(send(5, {}, flag).isNull());
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_EQ(backend().state(), kBackendStateUndecided);
+  EXPECT_TRUE(logged("HTTPSPostBackend(sendMessage): Batching 0, 1, 1"));
+  EXPECT_TRUE(logged("HTTPSPostBackend(sendMessage): realtime is 0"));
+  EXPECT_TRUE(logged("HTTPSPostBackend(sendMessage): realtime is 1"));
+  decided();
+  EXPECT_EQ(postedRecords(), 4u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AnExpediteMessageFreesAHeldBackEndAndIsItselfBatched) {
+  inState(kBackendStateHeld);
+  send(5);
+  send(5, {}, 2);
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_EQ(backend().state(), kBackendStateEnabled);
+  backend().setBatchEvents(false);
+  send(6);
+  EXPECT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(postedRecords(), 2u);
+}
+
+TEST_F(HTTPSPostBackendBatch, FlagThreeFreesAHeldBackEndTooAndFlagSixDoesNot) {
+  inState(kBackendStateHeld);
+  send(5, {}, 6);
+  EXPECT_EQ(backend().state(), kBackendStateHeld);
+  send(5, {}, 3);
+  EXPECT_EQ(backend().state(), kBackendStateEnabled);
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(HTTPSPostBackendBatch, WithoutUserInformationARequiringSessionBatchesEvenRealtimeEvents) {
+  inState(kBackendStateEnabled);
+  backend().setUserInfoDict(std::nullopt);
+  send(5, {}, 1);
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(HTTPSPostBackendBatch, SendsAloneWhatIsNotBatched) {
+  inState(kBackendStateEnabled);
+  backend().setBatchEvents(false);
+  const Value text = send(5);
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(events(0).size(), 1u);
+  EXPECT_EQ(poster_->requests[0].url, "https://post.example.org/events");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Event-Map"), "5 2");
+  ASSERT_NE(text.string(), nullptr);
+  EXPECT_EQ(std::get<Value>(platform_.json.parse(*text.string())), message(0));
+  EXPECT_TRUE(logged("HTTPSPostBackend(sendMessage): Sending 2, 0, 1"));
+  EXPECT_FALSE(backend().immutable());
+}
+
+TEST_F(HTTPSPostBackendBatch, ARealtimeEventWithoutABatchIsJustSent) {
+  inState(kBackendStateEnabled);
+  const Value text = send(5, {}, 1);
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(poster_->requests[0].url, "https://post.example.org/realtime");
+  EXPECT_FALSE(backend().immutable());
+  EXPECT_NE(text.string()->view().substr(0, 7), "Flushed");
+}
+
+TEST_F(HTTPSPostBackendBatch, ARealtimeEventFlushesTheBatchFirst) {
+  inState(kBackendStateEnabled);
+  send(5);
+  const Value text = send(6, {}, 1);
+  ASSERT_EQ(poster_->requests.size(), 2u);
+  EXPECT_EQ(events(0).at(0).find("_method")->intValue(), 5);
+  EXPECT_EQ(events(1).at(0).find("_method")->intValue(), 6);
+  const std::string_view shown = text.string()->view();
+  EXPECT_EQ(shown.substr(0, 17), "Flushed events:\n{");
+  EXPECT_NE(shown.find("\nStandalone event:\n{"), std::string_view::npos);
+  EXPECT_TRUE(backend().immutable());
+  EXPECT_TRUE(logged(
+      "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing "
+      "Flush here to keep events in order."));
+}
+
+TEST_F(HTTPSPostBackendBatch, WhereNothingMayBeShownNothingIsReturnedAndNothingFrozen) {
+  platform_.consent.setAllowed(false);
+  entry_.set("override_dnu", 1);
+  inState(kBackendStateEnabled);
+  send(5);
+  EXPECT_TRUE(send(6, {}, 1).isNull());
+  EXPECT_EQ(poster_->requests.size(), 2u);
+  EXPECT_FALSE(backend().immutable());
+}
+
+TEST_F(HTTPSPostBackendBatch, TheFiftyFirstRecordOfAMethodFlushesTheBatch) {
+  inState(kBackendStateEnabled);
+  send(9);
+  for (int i = 0; i < 50; ++i) EXPECT_TRUE(send(5).isNull());
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_FALSE(send(5).isNull());
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(events(0).size(), 51u);
+  EXPECT_TRUE(logged(
+      "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method 5"));
+  EXPECT_EQ(postedRecords(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, WithAThresholdOfZeroEveryRecordFlushesTheOneBefore) {
+  entry_.set("event_threshold", 0);
+  inState(kBackendStateEnabled);
+  for (int i = 0; i < 4; ++i) send(5);
+  EXPECT_EQ(poster_->requests.size(), 3u);
+  for (size_t i = 0; i < 3; ++i) EXPECT_EQ(events(i).size(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, CountsEachMethodForItself) {
+  entry_.set("event_threshold", 1);
+  inState(kBackendStateEnabled);
+  for (const uint16_t method : {5, 6, 4, 5, 6, 4}) send(method);
+  EXPECT_TRUE(poster_->requests.empty());
+  send(4);
+  EXPECT_EQ(poster_->requests.size(), 1u);
+  for (const uint16_t method : {5, 6, 4}) send(method);  // all counts began anew
+  EXPECT_EQ(poster_->requests.size(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, ReachingTheThresholdInStatesZeroAndThreeDiscardsTheBatch) {
+  for (const int32_t state : {kBackendStateUndecided, kBackendStateHeld}) {
+    inState(state);
+    for (int i = 0; i < 51; ++i) send(5);
+    EXPECT_EQ(dropped(Reason::batchDiscarded), 50u);
+    backend().setState(kBackendStateEnabled);
+    EXPECT_EQ(postedRecords(), 1u);
+    backend_.reset();
+    poster_->requests.clear();
+    backend();
+    break;
+  }
+  inState(kBackendStateHeld);
+  for (int i = 0; i < 51; ++i) send(5);
+  EXPECT_EQ(dropped(Reason::batchDiscarded), 100u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AForcedFlushThatKeepsTheBatchStillAppends) {
+  entry_.set("event_threshold", 0);
+  inState(kBackendStateEnabled);
+  backend().setUserInfoDict(std::nullopt);
+  for (int i = 0; i < 3; ++i) send(5);
+  EXPECT_TRUE(poster_->requests.empty());
+  backend().setUserInfoDict(userInfo_);
+  EXPECT_EQ(postedRecords(), 3u);
+}
+
+TEST_F(HTTPSPostBackendBatch, FlushingNothingSaysSo) {
+  inState(kBackendStateEnabled);
+  const FlushAnswer answer = flush();
+  EXPECT_EQ(answer.calls, 1);
+  EXPECT_TRUE(answer.result.isNull());
+  EXPECT_EQ(answer.error, (Error{kKYTReportingErrorDomain, -1, "Nothing to flush"}));
+  EXPECT_TRUE(backend().flushMessagesWithCompletion(nullptr).isNull());
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushWhileNotEnabledDiscardsTheBatch) {
+  inState(kBackendStateHeld);
+  send(5);
+  send(6);
+  EXPECT_EQ(flush().error, (Error{kKYTReportingErrorDomain, -1, "Nothing to flush"}));
+  EXPECT_EQ(dropped(Reason::batchDiscarded), 2u);
+  EXPECT_EQ(backend().batchedEventsSize(), 0u);
+  backend().setState(kBackendStateEnabled);
+  EXPECT_EQ(flush().error->localizedDescription, "Nothing to flush");
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(HTTPSPostBackendBatch, ADiscardedBatchForgetsItsCounts) {
+  entry_.set("event_threshold", 1);
+  inState(kBackendStateHeld);
+  send(5);
+  send(5);
+  flush();
+  backend().setState(kBackendStateEnabled);
+  send(5);
+  send(5);
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushWithoutRequiredUserInformationKeepsTheBatch) {
+  inState(kBackendStateEnabled);
+  send(5);
+  backend().setUserInfoDict(Dictionary{});
+  EXPECT_EQ(flush().error, (Error{kKYTReportingErrorDomain, -1, "Can not flush: userInfo is required"}));
+  backend().setUserInfoDict(userInfo_);
+  EXPECT_EQ(postedRecords(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushAnswersWhenItsPostIsAnswered) {
+  inState(kBackendStateEnabled);
+  send(5);
+  FlushAnswer answer;
+  const Value text = backend().flushMessagesWithCompletion(answer.completion());
+  EXPECT_EQ(answer.calls, 0);
+  poster_->answer(0, 200);
+  EXPECT_EQ(answer.calls, 1);
+  EXPECT_EQ(answer.result, text);
+  EXPECT_FALSE(answer.error);
+  EXPECT_NE(text.string()->view().find('\n'), std::string_view::npos);
+  EXPECT_FALSE(poster_->header(0, "X-KYT-Event-Map"));
+  EXPECT_TRUE(logged("HTTPSPostBackend(flushMessagesWithCompletion): called"));
+}
+
+TEST_F(HTTPSPostBackendBatch, PostsRecordsInTheirOrder) {
+  inState(kBackendStateEnabled);
+  for (uint16_t method = 1; method <= 5; ++method) send(method);
+  flush();
+  const std::vector<Dictionary> records = events(0);
+  ASSERT_EQ(records.size(), 5u);
+  for (uint16_t i = 0; i < 5; ++i) EXPECT_EQ(records[i].find("_method")->intValue(), i + 1);
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushWhoseRecordsAreAllRefusedPostsNothing) {
+  entry_.set("event_whitelist", Array{1});
+  inState(kBackendStateEnabled);
+  send(5);
+  const FlushAnswer answer = flush();
+  EXPECT_EQ(answer.error, (Error{kKYTReportingErrorDomain, -1,
+                                 "Nothing to flush: batched events were completely filtered out"}));
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_TRUE(logged(
+      "flushMessagesWithCompletion: Dropping event with category 5 as it is not whitelisted for backend "
+      "httppost"));
+  EXPECT_EQ(dropped(Reason::batchedEventFiltered), 1u);
+  EXPECT_FALSE(backend().immutable());
+  EXPECT_EQ(flush().error->localizedDescription, "Nothing to flush");
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushSkipsWhatTheBlacklistHolds) {
+  entry_.set("event_blacklist", Array{5});
+  inState(kBackendStateEnabled);
+  send(5);
+  send(6);
+  flush();
+  ASSERT_EQ(events(0).size(), 1u);
+  EXPECT_EQ(events(0)[0].find("_method")->intValue(), 6);
+  EXPECT_TRUE(logged(
+      "flushMessagesWithCompletion: Dropping event with category 5 as it is blacklisted for backend httppost"));
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushMergesTheFilteredUserInformationOfNow) {
+  userInfo_ = std::nullopt;
+  backend();
+  send(5, {{"extra", "payload"}});
+  backend().setUserInfoDict(Dictionary{{kKYTReportingUserInfoClientName, "a"},
+                                       {kKYTReportingUserInfoServiceName, "b"},
+                                       {"extra", "user"},
+                                       {"secret", "s"}});
+  decided();
+  flush();
+  const Dictionary record = events(0).at(0);
+  EXPECT_EQ(*record.find("extra"), Value("user"));
+  EXPECT_EQ(*record.find("ClientName"), Value("a"));
+  EXPECT_FALSE(record.contains("secret"));
+}
+
+TEST_F(HTTPSPostBackendBatch, AFilterBoundToAMethodDoesNotTouchTheUserInformationOfAFlush) {
+  entry_.set("filters", Array{Dictionary{{"key", "phone"}, {"action", "remove"}, {"method", 5}}});
+  userInfo_->set("phone", "1");
+  inState(kBackendStateEnabled);
+  send(5);
+  flush();
+  EXPECT_TRUE(events(0).at(0).contains("phone"));
+}
+
+TEST_F(HTTPSPostBackendBatch, SharedDataIsInTheRecord) {
+  inState(kBackendStateEnabled);
+  backend().sendMessage({{kKYTReportingMessageBlobClientData, Dictionary{{"k", 1}}},
+                         {kKYTReportingMessageBlobSharedData, Dictionary{{"shared", 2}, {"secret", 3}}}},
+                        {1, 0}, 5, 2, MessageFlag{});
+  flush();
+  EXPECT_EQ(events(0).at(0).find("shared")->intValue(), 2);
+  EXPECT_FALSE(events(0).at(0).contains("secret"));
+}
+
+TEST_F(HTTPSPostBackendBatch, ANewSessionIDIsWrittenIntoTheBatch) {
+  inState(kBackendStateEnabled);
+  send(5);
+  backend().setCorrelatedSessionID("12.77");
+  EXPECT_EQ(backend().combinedSessionIDString(), String("12.77"));
+  send(6);
+  flush();
+  for (const Dictionary& record : events(0)) EXPECT_EQ(*record.find("_sessionID"), Value("12.77"));
+  backend().setCorrelatedSessionID("13.77");  // without a batch
+}
+
+TEST_F(HTTPSPostBackendBatch, ReportsTheSizeOfItsRecords) {
+  inState(kBackendStateEnabled);
+  EXPECT_EQ(backend().batchedEventsSize(), 0u);
+  send(5, {{"k", std::string(1000, 'x')}});
+  const uint64_t one = backend().batchedEventsSize();
+  EXPECT_GT(one, 1000u);
+  send(5, {{"k", std::string(1000, 'x')}});
+  EXPECT_EQ(backend().batchedEventsSize(), 2 * one);
+  flush();
+  EXPECT_EQ(backend().batchedEventsSize(), 0u);
+}
+
+TEST_F(HTTPSPostBackendBatch, PastItsLimitDropsNewEventsAndSaysSoOnceAMinute) {
+  platform_.limits.maxBatchBytes = 20000;
+  inState(kBackendStateHeld);
+  for (int i = 0; i < 40; ++i) send(static_cast<uint16_t>(i), {{"k", std::string(1000, 'x')}});
+  const uint64_t first = dropped(Reason::batchFull);
+  EXPECT_GT(first, 20u);
+  EXPECT_LT(first, 35u);
+  const char line[] =
+      "HTTPSPostBackend(batchEvent): the batch of backend httppost is full (20000 bytes), dropping events";
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, line), 1u);
+  platform_.clock.advance(std::chrono::seconds(61));
+  send(1, {{"k", std::string(1000, 'x')}});
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, line), 2u);
+  backend().setState(kBackendStateEnabled);
+  EXPECT_EQ(postedRecords(), 40 - first);
+  EXPECT_TRUE(send(1).isNull());
+  EXPECT_EQ(postedRecords(), 1u);  // there is room again
+}
+
+TEST_F(HTTPSPostBackendBatch, CountsWhatContainersHoldTowardsItsLimit) {
+  platform_.limits.maxBatchBytes = 20000;
+  inState(kBackendStateHeld);
+  Array deep;
+  for (int i = 0; i < 30; ++i) deep.append(Value(Dictionary{{"k", std::string(1000, 'x')}}));
+  send(5, {{"array", deep}});
+  const std::string bytes(30000, 'x');
+  send(5, {{"data", Data(std::string_view(bytes))}});
+  EXPECT_EQ(dropped(Reason::batchFull), 2u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AppendsLaterOnTheStateQueue) {
+  inState(kBackendStateEnabled);
+  platform_.executor.runAll();
+  send(5);
+  EXPECT_EQ(platform_.executor.pending(), 1u);
+  platform_.executor.runAll();
+  EXPECT_EQ(postedRecords(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, CanBeDestroyedWithARecordOnItsWayIntoTheBatch) {
+  inState(kBackendStateEnabled);
+  send(5);
+  backend_.reset();
+  platform_.executor.runAll();
+}
+
+}  // namespace
+}  // namespace kyt

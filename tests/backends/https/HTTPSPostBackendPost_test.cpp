@@ -1,0 +1,366 @@
+// The message, its request, and what replies do.
+#include <openssl/evp.h>
+#include <openssl/hmac.h>
+
+#include <limits>
+
+#include "tests/backends/https/HTTPSFixture.h"
+
+namespace kyt {
+namespace {
+
+class HTTPSPostBackendPost : public HTTPSFixture {
+ protected:
+  // An enabled back end that sends each event alone.
+  HTTPSPostBackend& sending() {
+    entry_.set("expedite", 1);
+    return decided();
+  }
+  void post(std::string json, int32_t flag = 0, FlushCompletion completion = nullptr) {
+    backend().postJSONMessage(std::move(json), MessageFlag{flag}, std::nullopt, std::nullopt,
+                              std::move(completion));
+  }
+  Value clientID() {
+    const Value posted = message(poster_->requests.size() - 1);
+    const Value* id = posted.dictionary()->find("clientId");
+    return id != nullptr ? *id : Value();
+  }
+  std::string postedTo(const char* address) {
+    backend().setPostURL(String(address));
+    post("{}");
+    return poster_->requests.back().url;
+  }
+  void setInternalBuild() { platform_.deviceProperties.setProperty("ReleaseType", "Internal"); }
+};
+
+TEST_F(HTTPSPostBackendPost, TheMessageHasTimeClientAndEventsInThisOrder) {
+  platform_.clock.setTimeOfDay({1769860800, 250000});
+  sending();
+  send(5);
+  const Value posted = message(0);
+  std::vector<std::string> keys;
+  for (const DictionaryEntry& entry : *posted.dictionary()) keys.push_back(entry.key.str());
+  EXPECT_EQ(keys, (std::vector<std::string>{"postTime", "clientId", "events"}));
+  EXPECT_EQ(*posted.dictionary()->find("postTime"), Value(1769860800.25));
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidRespectDnu"));
+}
+
+TEST_F(HTTPSPostBackendPost, TheClientIDFollowsTheEntry) {
+  entry_.set("override_dnu", 1);
+  sending();
+  send(5);
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidOverrideDnu"));
+  entry_.set("custom_clientId", 1);
+  backend_.reset();
+  sending();
+  send(5);
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"));
+  entry_.set("extras_on_internal", 1);
+  backend_.reset();
+  sending();
+  send(5);
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"));
+  backend().setIsInternal(true);
+  send(5);
+  EXPECT_EQ(clientID(), Value("0123456789012345678901234567890123456789"));
+}
+
+TEST_F(HTTPSPostBackendPost, WithoutAClientIDCarriesItsTimeAlone) {
+  entry_.set("extras_on_internal", 1);
+  sending();
+  backend().setIsInternal(true);
+  backend().setUdid(nullptr);
+  send(5);
+  EXPECT_EQ(message(0).dictionary()->size(), 1u);
+  EXPECT_TRUE(message(0).dictionary()->contains("postTime"));
+}
+
+TEST_F(HTTPSPostBackendPost, TheBodyIsCompact) {
+  sending();
+  send(5);
+  std::string body(poster_->requests[0].body.view());
+  if (poster_->header(0, "Content-Encoding")) body = unzipped(body);
+  EXPECT_EQ(body.find_first_of("\n\t"), std::string::npos);
+  EXPECT_EQ(body.substr(0, 12), "{\"postTime\":");
+}
+
+TEST_F(HTTPSPostBackendPost, DatesBecomeSecondsAndWhatJSONCannotCarryGoes) {
+  sending();
+  const double infinity = std::numeric_limits<double>::infinity();
+  send(5, {{"date", Date{1.5}},
+           {"never", Date{infinity}},
+           {"array", Array{1}},
+           {"dictionary", Dictionary{{"a", 1}}},
+           {"data", Data(std::string_view("x"))},
+           {"null", Value()},
+           {"infinite", infinity},
+           {"true", true},
+           {"text", "x"}});
+  const Dictionary record = events(0).at(0);
+  EXPECT_EQ(*record.find("date"), Value(1.5));
+  EXPECT_EQ(*record.find("never"), Value(-1.0));
+  EXPECT_EQ(*record.find("true"), Value(true));
+  EXPECT_EQ(*record.find("text"), Value("x"));
+  for (const char* key : {"array", "dictionary", "data", "null", "infinite"})
+    EXPECT_FALSE(record.contains(key)) << key;
+  EXPECT_EQ(dropped(Reason::valueNotPostable), 5u);
+  EXPECT_TRUE(platform_.sink.contains(
+      LogLevel::error,
+      "HTTPSPostBackend(createMessageForPostAndLogging): JSONWriter unable to handle key: array, value: [1]"));
+  EXPECT_TRUE(platform_.sink.contains(
+      LogLevel::error,
+      "HTTPSPostBackend(createMessageForPostAndLogging): JSONWriter unable to handle key: null, value: (null)"));
+}
+
+TEST_F(HTTPSPostBackendPost, ShowsAPrettyTextOnlyWithConsentOrWhereForced) {
+  const auto shown = [this](bool consent, int environment, bool forced, int overrideDnu) {
+    platform_.consent.setAllowed(consent);
+    platform_.userDefaults.put(kKYTReportingDefaultsDomain, "environmentType", environment);
+    platform_.userDefaults.put(kKYTReportingDefaultsDomain, "forceEventLogging", forced);
+    entry_.set("override_dnu", overrideDnu);
+    backend_.reset();
+    sending();
+    return !send(5).isNull();
+  };
+  EXPECT_TRUE(shown(true, 4, false, 0));
+  EXPECT_FALSE(shown(true, 4, false, 1));
+  EXPECT_FALSE(shown(false, 4, true, 1));
+  EXPECT_FALSE(shown(false, 3, true, 1));
+  EXPECT_TRUE(shown(false, 2, true, 1));
+  EXPECT_TRUE(shown(false, 1, true, 1));
+  EXPECT_FALSE(shown(false, 1, false, 1));
+}
+
+TEST_F(HTTPSPostBackendPost, NobodyWhoAskedForNoPrettyTextPaysForOne) {
+  sending();
+  platform_.sink.clear();
+  EXPECT_TRUE(backend().createMessageForPostAndLogging(Array{Dictionary{{"k", 1}}}, nullptr));
+  EXPECT_FALSE(platform_.sink.contains("userDefaultsEnvironment"));
+}
+
+TEST_F(HTTPSPostBackendPost, SendsItsHeadersInOrder) {
+  sending();
+  backend().setIsInternal(true);
+  backend().setSelfVersion("8.1.2");
+  backend().setDigestKey(Data(std::string_view("key")));
+  send(5);
+  std::vector<std::string> names;
+  for (const auto& [name, value] : poster_->requests[0].headers) names.push_back(name);
+  EXPECT_EQ(names, (std::vector<std::string>{"X-KYT-Client-Name", "X-KYT-Service-Name",
+                                             "X-KYT-Internal-Build", "User-Agent", "X-KYT-Client-Version",
+                                             "X-KYT-Sender", "X-KYT-Event-Map", "Accept", "Content-Type",
+                                             "Content-Length", "Content-Encoding", "X-KYT-DIGEST"}));
+  EXPECT_EQ(poster_->header(0, "X-KYT-Client-Name"), "a");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Service-Name"), "b");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Internal-Build"), "1");
+  EXPECT_EQ(poster_->header(0, "User-Agent"), "KYTReporting/8.1.2 (Phone9,1; 17.1)");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Client-Version"), "3");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Sender"), "QG");
+  EXPECT_EQ(poster_->header(0, "X-KYT-Event-Map"), "5 2");
+  EXPECT_EQ(poster_->header(0, "Accept"), "application/json");
+  EXPECT_EQ(poster_->header(0, "Content-Type"), "application/json");
+  EXPECT_EQ(poster_->header(0, "Content-Length"), std::to_string(poster_->requests[0].body.size()));
+  EXPECT_EQ(poster_->header(0, "Content-Encoding"), "gzip");
+  EXPECT_EQ(poster_->requests[0].method, "POST");
+  EXPECT_TRUE(poster_->requests[0].allowsCellularAccess);
+  EXPECT_EQ(poster_->requests[0].maxRedirects, 0);
+}
+
+TEST_F(HTTPSPostBackendPost, LeavesOutHeadersThatDoNotApply) {
+  decided();
+  backend().setUserInfoDict(std::nullopt);
+  backend().setHardwareType(std::nullopt);
+  post("{}");
+  for (const char* name : {"X-KYT-Client-Name", "X-KYT-Service-Name", "X-KYT-Internal-Build",
+                           "X-KYT-Event-Map", "Content-Encoding", "X-KYT-DIGEST"})
+    EXPECT_FALSE(poster_->header(0, name)) << name;
+  EXPECT_EQ(poster_->header(0, "User-Agent"), "KYTReporting/8.0 ((null); 17.1)");
+  EXPECT_EQ(poster_->header(0, "Content-Length"), "2");
+}
+
+TEST_F(HTTPSPostBackendPost, AWiFiOnlyBackEndForbidsCellularAccess) {
+  entry_.set("use_wifi_only", 1);
+  decided();
+  post("{}");
+  EXPECT_FALSE(poster_->requests[0].allowsCellularAccess);
+}
+
+TEST_F(HTTPSPostBackendPost, CompressesOnlyWhatGetsShorter) {
+  decided();
+  post(std::string(120, 'a'));
+  EXPECT_EQ(poster_->header(0, "Content-Encoding"), "gzip");
+  EXPECT_EQ(unzipped(std::string(poster_->requests[0].body.view())), std::string(120, 'a'));
+  std::string noise;  // deflate finds nothing to shorten in it
+  uint32_t random = 1;
+  for (int i = 0; i < 120; ++i) noise += static_cast<char>((random = random * 1664525u + 1013904223u) >> 24);
+  post(noise);
+  EXPECT_FALSE(poster_->header(1, "Content-Encoding"));
+  EXPECT_EQ(poster_->requests[1].body.view(), noise);
+}
+
+TEST_F(HTTPSPostBackendPost, GoesUncompressedWhenCompressionFails) {
+  decided();
+  platform_.deflate.faults.initialize = -4;
+  post(std::string(1000, 'a'));
+  EXPECT_FALSE(poster_->header(0, "Content-Encoding"));
+  EXPECT_EQ(poster_->requests[0].body.size(), 1000u);
+}
+
+TEST_F(HTTPSPostBackendPost, SignsTheBodyAsItIsSent) {
+  decided();
+  const std::string key("a digest key");
+  backend().setDigestKey(Data(std::string_view(key)));
+  post(std::string(500, 'a'));
+  const std::string_view body = poster_->requests[0].body.view();
+  unsigned char digest[EVP_MAX_MD_SIZE];
+  unsigned length = 0;
+  HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()),
+       reinterpret_cast<const unsigned char*>(body.data()), body.size(), digest, &length);
+  ASSERT_EQ(length, 20u);
+  std::string expected("<");
+  for (unsigned i = 0; i < length; ++i) {
+    char digits[4];
+    std::snprintf(digits, sizeof digits, "%02x", digest[i]);
+    if (i != 0 && i % 4 == 0) expected += ' ';
+    expected += digits;
+  }
+  EXPECT_EQ(poster_->header(0, "X-KYT-DIGEST"), expected + ">");
+}
+
+TEST_F(HTTPSPostBackendPost, KnowsNoOtherDigestAlgorithm) {
+  decided();
+  backend().setDigestKey(Data(std::string_view("key")));
+  backend().setDigestAlgorithm(1);
+  post("{}");
+  EXPECT_FALSE(poster_->header(0, "X-KYT-DIGEST"));
+}
+
+TEST_F(HTTPSPostBackendPost, ForcesHTTPSOnDevicesOfUsers) {
+  decided();
+  EXPECT_EQ(postedTo("http://a.example.org/x"), "https://a.example.org/x");
+  EXPECT_EQ(postedTo("HTTPS://a.example.org/x"), "HTTPS://a.example.org/x");
+  EXPECT_EQ(postedTo("ftp://a.example.org/?u=http://b"), "https://a.example.org/?u=http");
+  EXPECT_EQ(postedTo("https://a.example.org/?u=http://b"), "https://a.example.org/?u=http://b");
+  EXPECT_EQ(postedTo("a.example.org"), "a.example.org");
+}
+
+TEST_F(HTTPSPostBackendPost, LeavesTheSchemeOnInternalBuilds) {
+  setInternalBuild();
+  decided();
+  EXPECT_EQ(postedTo("http://a.example.org/x"), "http://a.example.org/x");
+}
+
+TEST_F(HTTPSPostBackendPost, WithoutAnAddressPostsNothing) {
+  decided();
+  backend().setPostURL(std::nullopt);
+  FlushAnswer answer;
+  post("{}", 0, answer.completion());
+  EXPECT_EQ(answer.error, (Error{kKYTReportingErrorDomain, -1, "postURL is nil"}));
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_EQ(dropped(Reason::postWithoutURL), 1u);
+}
+
+TEST_F(HTTPSPostBackendPost, ARealtimePostNeedsTheRealtimeAddress) {
+  backend().setPostURL(String("https://post.example.org"));
+  FlushAnswer answer;
+  post("{}", 1, answer.completion());
+  EXPECT_EQ(answer.error->localizedDescription, "postURL is nil");
+  post("{}", 2);
+  EXPECT_EQ(poster_->requests.size(), 1u);
+}
+
+TEST_F(HTTPSPostBackendPost, WithoutAPosterNothingIsSentAndNobodyIsTold) {
+  decided();
+  poster_.reset();
+  FlushAnswer answer;
+  post("{}", 0, answer.completion());
+  EXPECT_EQ(answer.calls, 0);
+  EXPECT_EQ(dropped(Reason::postWithoutPoster), 1u);
+}
+
+TEST_F(HTTPSPostBackendPost, AReplyOf5xxDisablesTheBackEnd) {
+  for (const int status : {500, 503, 599}) {
+    backend_.reset();
+    poster_ = std::make_shared<RecordingPoster>();
+    decided();
+    FlushAnswer answer;
+    post("{}", 0, answer.completion());
+    poster_->answer(0, status);
+    EXPECT_EQ(backend().state(), kBackendStateDisabled);
+    const std::string text = "backend httppost disabled by server " + std::to_string(status) + " return code";
+    EXPECT_EQ(answer.error, (Error{kKYTReportingErrorDomain, status, text}));
+    EXPECT_TRUE(platform_.sink.contains(LogLevel::normal, "postJSONMessage: " + text));
+    EXPECT_TRUE(answer.result.isNull());
+  }
+  EXPECT_EQ(dropped(Reason::postRefused), 3u);
+}
+
+TEST_F(HTTPSPostBackendPost, AnyOtherReplyDoesNot) {
+  for (const int status : {200, 302, 404, 499, 600}) {
+    backend_.reset();
+    poster_ = std::make_shared<RecordingPoster>();
+    decided();
+    FlushAnswer answer;
+    post("{}", 0, answer.completion());
+    poster_->answer(0, status);
+    EXPECT_EQ(backend().state(), kBackendStateEnabled) << status;
+    EXPECT_EQ(answer.calls, 1);
+    EXPECT_FALSE(answer.error);
+  }
+  EXPECT_EQ(dropped(Reason::postRefused), 2u);
+}
+
+TEST_F(HTTPSPostBackendPost, ADisabledBackEndMayBeEnabledAgain) {
+  decided();
+  post("{}");
+  poster_->answer(0, 503);
+  EXPECT_EQ(backend().state(), kBackendStateDisabled);
+  backend().updateState();
+  EXPECT_EQ(backend().state(), kBackendStateEnabled);
+}
+
+TEST_F(HTTPSPostBackendPost, ATransportErrorIsLoggedCountedAndPassedOn) {
+  decided();
+  FlushAnswer answer;
+  post("{}", 0, answer.completion());
+  const Error error{kKYTURLErrorDomain, 7, "no connection"};
+  poster_->fail(0, error);
+  EXPECT_EQ(answer.error, error);
+  EXPECT_EQ(backend().state(), kBackendStateEnabled);
+  EXPECT_EQ(dropped(Reason::postFailed), 1u);
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::error,
+                                      "HTTPSPostBackend(postJsonMessage): post error: no connection"));
+}
+
+TEST_F(HTTPSPostBackendPost, AReplyWithoutACompletionIsTakenToo) {
+  decided();
+  post("{}");
+  poster_->answer(0, 503);
+  EXPECT_EQ(backend().state(), kBackendStateDisabled);
+}
+
+TEST_F(HTTPSPostBackendPost, AReplyThatFindsItsBackEndGoneStillCallsItsCompletion) {
+  decided();
+  send(5);
+  FlushAnswer answer;
+  const Value text = backend().flushMessagesWithCompletion(answer.completion());
+  backend_.reset();
+  poster_->answer(0, 503);
+  EXPECT_EQ(answer.calls, 1);
+  EXPECT_EQ(answer.result, text);
+  EXPECT_EQ(answer.error->code, 503);
+}
+
+TEST_F(HTTPSPostBackendPost, ACompletionMayUseTheStateQueueAgain) {
+  decided();
+  send(5);
+  int32_t seen = -1;
+  backend().setRequireUserInfo(true);
+  backend().setUserInfoDict(std::nullopt);
+  backend().flushMessagesWithCompletion(
+      [&](const Value&, const std::optional<Error>&) { seen = backend().state(); });
+  EXPECT_EQ(seen, kBackendStateEnabled);
+}
+
+}  // namespace
+}  // namespace kyt
