@@ -1,69 +1,49 @@
 #include "tools/TomlValues.h"
 
 #include <algorithm>
-#include <ctime>
 #include <string>
+#include <utility>
 #include <vector>
-// After the standard headers: the parser is header-only, and this is the only file of the tools that pays for
-// it.
-#include <toml++/toml.h>
+
+#include "platform/linux/system/Toml.h"
 
 namespace kyt::tools {
 
 namespace {
 
-Value converted(const toml::node& node);
+Value converted(const TomlNode& node);
 
-double seconds(const toml::date_time& value) {
-  std::tm parts{};
-  parts.tm_year = value.date.year - 1900;
-  parts.tm_mon = value.date.month - 1;
-  parts.tm_mday = value.date.day;
-  parts.tm_hour = value.time.hour;
-  parts.tm_min = value.time.minute;
-  parts.tm_sec = value.time.second;
-  const double offset = value.offset ? value.offset->minutes * 60.0 : 0.0;
-  return static_cast<double>(timegm(&parts)) - offset + value.time.nanosecond / 1e9;
-}
-
-Dictionary convertedTable(const toml::table& table) {
-  // The parser sorts its keys; where they stand in the text is still known.
-  std::vector<std::pair<const toml::key*, const toml::node*>> entries;
+Dictionary convertedTable(const TomlTable& table) {
+  // By line, since that is the order in which their author thinks of them; within a line by name.
+  std::vector<std::pair<const std::string*, const TomlNode*>> entries;
   for (const auto& [key, node] : table) entries.emplace_back(&key, &node);
-  std::stable_sort(entries.begin(), entries.end(), [](const auto& a, const auto& b) {
-    return a.first->source().begin < b.first->source().begin;
-  });
+  std::stable_sort(entries.begin(), entries.end(),
+                   [](const auto& a, const auto& b) { return a.second->line < b.second->line; });
   Dictionary out;
-  for (const auto& [key, node] : entries) out.set(String(key->str()), converted(*node));
+  for (const auto& [key, node] : entries) out.set(String(*key), converted(*node));
   return out;
 }
 
-Value converted(const toml::node& node) {
-  if (const auto* table = node.as_table()) return convertedTable(*table);
-  if (const auto* array = node.as_array()) {
+Value converted(const TomlNode& node) {
+  if (const TomlTable* table = node.table()) return convertedTable(*table);
+  if (const TomlArray* array = node.array()) {
     Array out;
-    for (const toml::node& element : *array) out.append(converted(element));
+    for (const TomlNode& element : *array) out.append(converted(element));
     return out;
   }
-  if (const auto* text = node.as_string()) return Value(text->get());
-  if (const auto* integer = node.as_integer()) return Value(static_cast<long long>(integer->get()));
-  if (const auto* number = node.as_floating_point()) return Value(number->get());
-  if (const auto* boolean = node.as_boolean()) return Value(boolean->get());
-  if (const auto* date = node.as_date_time()) return Value(Date{seconds(date->get())});
-  return Value();
+  if (const std::string* text = node.text()) return Value(*text);
+  if (const auto* integer = std::get_if<int64_t>(&node.value)) return Value(*integer);
+  if (const auto* number = std::get_if<double>(&node.value)) return Value(*number);
+  if (const auto* boolean = std::get_if<bool>(&node.value)) return Value(*boolean);
+  return Value();  // a date or a time: bags have none
 }
 
 }  // namespace
 
 std::variant<Value, Error> parseToml(std::string_view text) {
-  try {
-    return Value(convertedTable(toml::parse(text)));
-  } catch (const toml::parse_error& error) {
-    const auto& at = error.source().begin;
-    return Error{"KYTToolsErrorDomain", -1,
-                 "line " + std::to_string(at.line) + ", column " + std::to_string(at.column) + ": " +
-                     std::string(error.description())};
-  }
+  auto parsed = kyt::parseToml(text, "bag");
+  if (const auto* error = std::get_if<TomlError>(&parsed)) return Error{"KYTToolsErrorDomain", -1, error->text};
+  return Value(convertedTable(std::get<TomlTable>(parsed)));
 }
 
 }  // namespace kyt::tools

@@ -1,0 +1,61 @@
+#include "tools/demo/DemoBag.h"
+
+namespace kyt::tools {
+
+namespace {
+
+Dictionary client(const std::string& name, const std::string& base) {
+  return {{"client", name},
+          {"service", "demo"},
+          {"expedite", 0},
+          {"locale_whitelist", Array{"DE", "FR"}},
+          {"filters", Array{Dictionary{{"key", "secret"}, {"action", "remove"}},
+                            Dictionary{{"key", "account"}, {"action", "sha256"}}}},
+          {"sampling_threshold", 1.0},
+          {"event_threshold", 49},
+          {"post_url", base + "/events/" + name},
+          {"realtime_post_url", base + "/events/" + name + "/realtime"}};
+}
+
+std::string script(const std::string& name, int sessionID) {
+  const std::string user = "{\"ClientName\":\"" + name + "\",\"ServiceName\":\"demo\"}";
+  std::string text =
+      "{\"do\":\"open\",\"sessionInfo\":{\"SessionID\":" + std::to_string(sessionID) +
+      ",\"ClientType\":20,\"ClientVersion\":3,\"BatchEvent\":true,\"RequireUserInfo\":true},\"userInfo\":" +
+      user + "}\n";
+  text += "{\"do\":\"configure\"}\n";
+  text += std::string("{\"do\":\"digestKey\",\"hex\":\"") + kDemoDigestKeyHex + "\",\"algorithm\":0}\n";
+  text += "{\"do\":\"displayURL\"}\n";
+  text +=
+      std::string(
+          "{\"do\":\"send\",\"category\":10,\"type\":1,\"repeat\":5,\"payload\":{\"duration\":1.5,\"count\":3,"
+          "\"secret\":\"never leaves\",\"account\":\"") +
+      kDemoAccount + "\"}}\n";
+  text += "{\"do\":\"flush\"}\n";
+  text +=
+      "{\"do\":\"send\",\"category\":20,\"type\":2,\"flag\":1,\"reply\":true,\"payload\":{\"urgent\":true}}\n";
+  text += "{\"do\":\"send\",\"category\":11,\"type\":1,\"repeat\":2,\"payload\":{\"late\":\"yes\"}}\n";
+  text += "{\"do\":\"finish\"}\n";
+  return text;
+}
+
+}  // namespace
+
+Dictionary demoBag(const std::string& serverBase) {
+  const Dictionary section = {
+      {"qrs",
+       Dictionary{{"display_url", serverBase + "/"}, {"clients", Array{client("kytdemo", serverBase)}}}},
+      {"httppost", Dictionary{{"display_url", serverBase + "/"},
+                              {"clients", Array{client("kytdemo-plain", serverBase)}}}}};
+  return {{"version", "demo-1"}, {"refresh_cycle", 3600}, {"release", section}, {"vantu_internal", section}};
+}
+
+std::string signedClientScript() {
+  return script("kytdemo", 7001);
+}
+
+std::string plainClientScript() {
+  return script("kytdemo-plain", 7002);
+}
+
+}  // namespace kyt::tools

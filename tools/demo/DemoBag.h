@@ -1,0 +1,24 @@
+// What the demonstration reports, and the storebag that governs it.
+#pragma once
+
+#include <string>
+
+#include "platform/Value.h"
+
+namespace kyt::tools {
+
+// The events of both clients, start and stop messages included: 6 batched and flushed, 1 realtime and 3 at
+// the end for the signed one; the same for the plain one.
+inline constexpr int kDemoEvents = 20;
+inline constexpr char kDemoDigestKeyHex[] = "6b79742d64656d6f2d646967657374";
+inline constexpr char kDemoAccount[] = "owner@example.org";
+
+// For client types 7, 11, 13 and 20 ("cadmor"): the clients "kytdemo" (back end "qrs", posts signed with the
+// digest key) and "kytdemo-plain" (back end "httppost").
+[[nodiscard]] Dictionary demoBag(const std::string& serverBase);
+
+// Sessions in kytctl's script form.
+[[nodiscard]] std::string signedClientScript();
+[[nodiscard]] std::string plainClientScript();
+
+}  // namespace kyt::tools

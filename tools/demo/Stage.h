@@ -1,0 +1,77 @@
+// A private place where the daemon and the development server run together: a folder that stands for the file
+// system's root, with keys, settings, entitlements, device properties, consent and signed storebags. Used by
+// the demonstration
+// (`./kyt run`), by the tests of the whole daemon and by the benchmarks. One thread.
+#pragma once
+
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "platform/Error.h"
+#include "platform/Value.h"
+#include "tools/demo/ChildProcess.h"
+
+namespace kyt::tools {
+
+class Stage {
+ public:
+  struct Options {
+    std::string programs;  // the folder of kytreportingd, kytdevserver and kytctl
+    std::string share;     // bundles and the confinement profile, as installed in share/kytreporting's parent
+    std::string folder;    // none: a new temporary one, removed at the end
+    bool internalBuild = false;
+    bool consent = true;
+    std::string country = "DE";
+    std::string logLevel = "default";
+    std::string extraSettings;                 // appended to kytreportingd.toml
+    std::vector<std::string> serverArguments;  // further ones for the development server
+    bool keepFolder = false;
+  };
+  // The folder laid out, the development server running. The daemon is started by startDaemon().
+  [[nodiscard]] static std::variant<std::unique_ptr<Stage>, Error> make(Options options);
+  ~Stage();
+  Stage(const Stage&) = delete;
+  Stage& operator=(const Stage&) = delete;
+
+  // Signs the bag and lets the server hand it out under that name.
+  [[nodiscard]] std::optional<Error> putStorebag(const std::string& name, const Dictionary& bag);
+  // Starts it and waits until its socket takes connections.
+  [[nodiscard]] std::optional<Error> startDaemon();
+  // SIGTERM, then the exit status (none: it did not end within `timeout`).
+  [[nodiscard]] std::optional<int> stopDaemon(std::chrono::milliseconds timeout = std::chrono::seconds(15));
+  [[nodiscard]] ChildProcess* daemon() { return daemon_ ? &*daemon_ : nullptr; }
+  [[nodiscard]] ChildProcess* server() { return server_ ? &*server_ : nullptr; }
+
+  // The answer to a query of the development server ("/api/…"), or null.
+  [[nodiscard]] Value query(const std::string& path) const;
+  // Whether so many events have arrived within `seconds`.
+  [[nodiscard]] bool waitForEvents(int64_t count, int seconds) const;
+  [[nodiscard]] bool control(const std::string& path, const std::string& json) const;
+
+  [[nodiscard]] const std::string& folder() const { return options_.folder; }
+  [[nodiscard]] std::string program(const std::string& name) const { return options_.programs + "/" + name; }
+  [[nodiscard]] std::string socketPath() const {
+    return options_.folder + "/run/kytreportingd/com.vantu.kytreportingd";
+  }
+  [[nodiscard]] std::string daemonLog() const { return options_.folder + "/daemon.log"; }
+  [[nodiscard]] std::string serverLog() const { return options_.folder + "/server.log"; }
+  [[nodiscard]] std::string httpsBase() const { return "https://127.0.0.1:" + std::to_string(httpsPort_); }
+  [[nodiscard]] std::string httpBase() const { return "http://127.0.0.1:" + std::to_string(httpPort_); }
+
+ private:
+  explicit Stage(Options options) : options_(std::move(options)) {}
+  [[nodiscard]] std::optional<Error> layOut();
+  [[nodiscard]] std::optional<Error> startServer();
+  [[nodiscard]] std::optional<Error> writeConfiguration();
+
+  Options options_;
+  std::string privateKey_;
+  long httpsPort_ = 0, httpPort_ = 0;
+  std::optional<ChildProcess> server_, daemon_;
+};
+
+}  // namespace kyt::tools

@@ -1,0 +1,103 @@
+// kytdemo: the main job from end to end on one machine, behind `./kyt run`. Starts the development server and
+// the daemon under a private root, lets real client processes report real events, checks each of them at the
+// server, prints what arrived where, and stays up with the page open until Ctrl-C (or ends: --once).
+#include <signal.h>
+
+#include <CLI/CLI.hpp>
+#include <cstdio>
+
+#include "platform/TextEscape.h"
+#include "tools/StorebagFile.h"
+#include "tools/demo/Checks.h"
+#include "tools/demo/DemoBag.h"
+#include "tools/demo/Stage.h"
+
+namespace {
+
+using namespace kyt;
+using namespace kyt::tools;
+
+int complain(const std::string& text) {
+  std::fprintf(stderr, "kytdemo: %s\n", escapedText(text).c_str());
+  return 1;
+}
+
+// One client process: kytctl running a scripted session on the daemon's socket.
+std::optional<std::string> runClient(Stage& stage, const std::string& name, const std::string& script) {
+  const std::string file = stage.folder() + "/" + name + ".session";
+  if (auto error = writeFile(file, script, 0644)) return error->localizedDescription;
+  ChildProcess::Options how;
+  how.outputFile = stage.folder() + "/" + name + ".log";
+  auto client =
+      ChildProcess::start(stage.program("kytctl"), {"session", "--socket", stage.socketPath(), file}, how);
+  if (!client) return "kytctl cannot be started";
+  const std::optional<int> status = client->wait(std::chrono::seconds(60));
+  if (status == 0) return std::nullopt;
+  auto said = readFile(how.outputFile);
+  return "the client process " + name + " failed: " + (said.index() == 0 ? std::get<std::string>(said) : "");
+}
+
+void waitForInterrupt() {
+  sigset_t set;
+  sigemptyset(&set);
+  sigaddset(&set, SIGINT);
+  sigaddset(&set, SIGTERM);
+  int number = 0;
+  sigwait(&set, &number);
+}
+
+int demonstrate(Stage& stage, bool once) {
+  if (auto error = stage.putStorebag("cadmor", demoBag(stage.httpsBase())))
+    return complain(error->localizedDescription);
+  if (auto error = stage.startDaemon()) return complain(error->localizedDescription);
+  std::printf("daemon    socket %s, log %s\nserver    %s, page %s/\n", stage.socketPath().c_str(),
+              stage.daemonLog().c_str(), stage.httpsBase().c_str(), stage.httpBase().c_str());
+  if (auto problem = runClient(stage, "signed", signedClientScript())) return complain(*problem);
+  if (auto problem = runClient(stage, "plain", plainClientScript())) return complain(*problem);
+  if (!stage.waitForEvents(kDemoEvents, 30))
+    std::printf("not all of %d events arrived within 30 s\n", kDemoEvents);
+
+  int wrong = 0;
+  for (const Check& check : checkArrivals(stage)) {
+    std::printf("%s  %s%s%s\n", check.holds ? "ok   " : "WRONG", check.what.c_str(), check.holds ? "" : ": ",
+                check.holds ? "" : escapedText(check.found).c_str());
+    if (!check.holds) ++wrong;
+  }
+  printArrivals(stage);
+  if (!once) {
+    std::printf("\nThe page is at %s/ ; Ctrl-C ends the daemon and the server.\n", stage.httpBase().c_str());
+    std::fflush(stdout);
+    waitForInterrupt();
+  }
+  const std::optional<int> status = stage.stopDaemon();
+  if (status != 0) ++wrong;
+  std::printf("%s  the daemon ended with status 0 after SIGTERM\n", status == 0 ? "ok   " : "WRONG");
+  return wrong == 0 ? 0 : 1;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app("The daemon, the development server and real clients on this machine.", "kytdemo");
+  Stage::Options options;
+  bool once = false;
+  app.add_option("--programs", options.programs, "folder of the programs")->required();
+  app.add_option("--share", options.share, "folder of kytreporting/ with the bundles and the profile")
+      ->required();
+  app.add_option("--folder", options.folder, "lay out here and keep it (default: a temporary folder)");
+  app.add_flag("--once", once, "end after the checks; status 0 only if every event arrived as it should");
+  CLI11_PARSE(app, argc, argv);
+  options.keepFolder = !options.folder.empty();
+  options.serverArguments = {"--digest-key", std::string("kytdemo=") + kDemoDigestKeyHex};
+  // Children inherit a clean mask; this process takes the two signals when it waits for them.
+  if (!once) {
+    sigset_t set;
+    sigemptyset(&set);
+    sigaddset(&set, SIGINT);
+    sigaddset(&set, SIGTERM);
+    pthread_sigmask(SIG_BLOCK, &set, nullptr);
+  }
+  auto stage = Stage::make(std::move(options));
+  if (auto* error = std::get_if<Error>(&stage)) return complain(error->localizedDescription);
+  return demonstrate(*std::get<std::unique_ptr<Stage>>(stage), once);
+}

@@ -1,0 +1,59 @@
+// The commands of kytctl: each takes what the command line said and answers the exit status: 0 done, 1 it
+// could not be done (with a line on standard error), 2 wrong usage. Output for people and scripts goes to
+// standard output.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Error.h"
+
+namespace kyt::tools {
+
+struct ConnectionOptions {
+  std::string root;    // in front of every fixed path, as the daemon's --root
+  std::string socket;  // instead of the fixed one
+  double timeoutSeconds = 30;
+};
+
+struct SendOptions {
+  int clientType = 0;
+  uint32_t sessionID = 1;
+  uint16_t clientVersion = 1;
+  uint16_t category = 0, type = 0;
+  std::string payloadJSON = "{}";
+  std::string userInfoJSON;  // empty: none
+  bool requireUserInfo = false;
+};
+
+struct SignOptions {
+  std::string bag;     // .json, .toml or .plist
+  std::string key;     // private key, PEM
+  std::string output;  // "-": standard output
+};
+
+[[nodiscard]] int sendCommand(const ConnectionOptions& connection, const SendOptions& options);
+[[nodiscard]] int sessionCommand(const ConnectionOptions& connection, const std::string& script);
+
+[[nodiscard]] int defaultsReadCommand(const std::string& root, const std::string& domain,
+                                      const std::string& key);
+// `type`: string, integer, real, boolean; `value` none deletes the key.
+[[nodiscard]] int defaultsWriteCommand(const std::string& root, const std::string& domain,
+                                       const std::string& key, const std::string& type,
+                                       const std::optional<std::string>& value);
+// `change`: "show", "grant" or "withdraw".
+[[nodiscard]] int consentCommand(const std::string& root, const std::string& change);
+
+[[nodiscard]] int makeKeysCommand(const std::string& folder, unsigned bits);
+[[nodiscard]] int signCommand(const SignOptions& options);
+[[nodiscard]] int verifyCommand(const std::string& document, const std::string& publicKey);
+// With a public key the signature is checked first.
+[[nodiscard]] int showCommand(const std::string& document, const std::string& publicKey);
+
+// "kytctl: TEXT" on standard error, with control characters escaped; answers 1.
+int failed(const Error& error);
+int failed(const std::string& text);
+
+}  // namespace kyt::tools

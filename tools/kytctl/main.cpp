@@ -1,0 +1,135 @@
+// kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
+// consent, makes keys, signs and checks storebags.
+#include <CLI/CLI.hpp>
+#include <cstdio>
+
+#include "tools/kytctl/Commands.h"
+
+namespace {
+
+using namespace kyt::tools;
+
+struct Arguments {
+  ConnectionOptions connection;
+  SendOptions send;
+  SignOptions sign;
+  std::string script, domain, key, value, type = "string", folder, document, publicKey;
+  unsigned bits = 2048;
+  int status = 0;
+};
+
+void addConnectionOptions(CLI::App& command, Arguments& arguments) {
+  command.add_option("--socket", arguments.connection.socket,
+                     "the daemon's socket, instead of the fixed one");
+  command.add_option("--timeout", arguments.connection.timeoutSeconds, "seconds to wait for the daemon")
+      ->check(CLI::Range(0.1, 3600.0));
+}
+
+void addSend(CLI::App& app, Arguments& a) {
+  CLI::App* send = app.add_subcommand("send", "send one event without a session of its own");
+  addConnectionOptions(*send, a);
+  send->add_option("--client-type", a.send.clientType, "0 to 23")->required();
+  send->add_option("--session-id", a.send.sessionID, "32 bits");
+  send->add_option("--client-version", a.send.clientVersion, "16 bits");
+  send->add_option("--category", a.send.category, "the event's category (method)")->required();
+  send->add_option("--type", a.send.type, "the event's type (response code)")->required();
+  send->add_option("--payload", a.send.payloadJSON, "a JSON object");
+  send->add_option("--user-info", a.send.userInfoJSON,
+                   "a JSON object; ClientName and ServiceName choose the client entry");
+  send->add_flag("--require-user-info", a.send.requireUserInfo, "the session promises user information");
+  send->callback([&a] { a.status = sendCommand(a.connection, a.send); });
+
+  CLI::App* session =
+      app.add_subcommand("session", "run a scripted session: one JSON object a line (kytctl session --help)");
+  addConnectionOptions(*session, a);
+  session->add_option("script", a.script, "a file, or - for standard input")->required();
+  session->footer(
+      "Steps, by \"do\":\n"
+      "  {\"do\":\"open\",\"sessionInfo\":{…},\"userInfo\":{…}}      first; the keys are SessionID, "
+      "ClientType, …\n"
+      "  {\"do\":\"configure\"}                                    prints the live back ends\n"
+      "  {\"do\":\"states\",\"userInfo\":{…}}                        new user information; prints the live "
+      "back ends\n"
+      "  "
+      "{\"do\":\"send\",\"category\":1,\"type\":2,\"payload\":{…},\"flag\":0,\"repeat\":1,\"reply\":false}\n"
+      "  {\"do\":\"flush\"}  {\"do\":\"displayURL\"}  {\"do\":\"finish\"}\n"
+      "  {\"do\":\"sharedData\",\"entries\":{…}}                     null removes a key\n"
+      "  {\"do\":\"digestKey\",\"hex\":\"00ff…\",\"algorithm\":0}");
+  session->callback([&a] { a.status = sessionCommand(a.connection, a.script); });
+}
+
+void addDefaults(CLI::App& app, Arguments& a) {
+  CLI::App* defaults = app.add_subcommand("defaults", "user defaults by domain and key");
+  defaults->require_subcommand(1);
+  CLI::App* read = defaults->add_subcommand("read", "print a value, or all of a domain");
+  read->add_option("domain", a.domain)->required();
+  read->add_option("key", a.key);
+  read->callback([&a] { a.status = defaultsReadCommand(a.connection.root, a.domain, a.key); });
+  CLI::App* write = defaults->add_subcommand("write", "store a value");
+  write->add_option("domain", a.domain)->required();
+  write->add_option("key", a.key)->required();
+  write->add_option("value", a.value)->required();
+  write->add_option("--type", a.type)->check(CLI::IsMember({"string", "integer", "real", "boolean"}));
+  write->callback(
+      [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, a.value); });
+  CLI::App* erase = defaults->add_subcommand("delete", "remove a value");
+  erase->add_option("domain", a.domain)->required();
+  erase->add_option("key", a.key)->required();
+  erase->callback(
+      [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, std::nullopt); });
+
+  CLI::App* consent = app.add_subcommand("consent", "the owner's consent to diagnostics-and-usage upload");
+  consent->require_subcommand(1);
+  for (const char* change : {"show", "grant", "withdraw"})
+    consent->add_subcommand(change)->callback(
+        [&a, change] { a.status = consentCommand(a.connection.root, change); });
+}
+
+void addStorebag(CLI::App& app, Arguments& a) {
+  CLI::App* keys = app.add_subcommand("keys", "keys for signing storebags");
+  keys->require_subcommand(1);
+  CLI::App* make = keys->add_subcommand("make", "write private.pem and publicKey.der into a folder");
+  make->add_option("folder", a.folder)->required();
+  make->add_option("--bits", a.bits, "2048 to 16384");
+  make->callback([&a] { a.status = makeKeysCommand(a.folder, a.bits); });
+
+  CLI::App* bag = app.add_subcommand("storebag", "signed configurations");
+  bag->require_subcommand(1);
+  CLI::App* sign = bag->add_subcommand("sign", "sign a bag into the document that servers hand out");
+  sign->add_option("bag", a.sign.bag, "FILE.json, FILE.toml or FILE.plist")->required();
+  sign->add_option("--key", a.sign.key, "the private key, PEM")->required();
+  sign->add_option("-o,--output", a.sign.output, "the document; - for standard output")->required();
+  sign->callback([&a] { a.status = signCommand(a.sign); });
+  CLI::App* verify = bag->add_subcommand("verify", "check a document's signature");
+  verify->add_option("document", a.document)->required();
+  verify->add_option("--public-key", a.publicKey, "publicKey.der")->required();
+  verify->callback([&a] { a.status = verifyCommand(a.document, a.publicKey); });
+  CLI::App* show =
+      bag->add_subcommand("show", "print the bag of a document as JSON, and what in it may surprise");
+  show->add_option("document", a.document)->required();
+  show->add_option("--public-key", a.publicKey, "check the signature first");
+  show->callback([&a] { a.status = showCommand(a.document, a.publicKey); });
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app("The command for people around kytreportingd.", "kytctl");
+  Arguments arguments;
+  app.add_option("--root", arguments.connection.root,
+                 "stands in front of every fixed path, as the daemon's --root");
+  app.require_subcommand(1);
+  app.fallthrough();
+  addSend(app, arguments);
+  addDefaults(app, arguments);
+  addStorebag(app, arguments);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& error) {
+    return app.exit(error) == 0 ? 0 : 2;
+  } catch (const std::exception& error) {
+    std::fprintf(stderr, "kytctl: %s\n", error.what());
+    return 1;
+  }
+  return arguments.status;
+}
