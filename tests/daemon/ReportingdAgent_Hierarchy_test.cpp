@@ -1,0 +1,206 @@
+// Hierarchies of sessions: parents, combined identifiers, aggregators.
+#include "tests/daemon/AgentFixture.h"
+
+namespace kyt {
+namespace {
+
+class AgentHierarchy : public AgentFixture {
+ protected:
+  std::optional<std::string> parentID(const Client& client) {
+    const std::optional<String> id = agent_.parentSessionIDStringForSession(*client.session);
+    return id ? std::optional<std::string>(id->str()) : std::nullopt;
+  }
+  static std::string id(const Client& client) { return client.session->sessionIDString().str(); }
+};
+
+TEST_F(AgentHierarchy, ASessionWithoutATokenIsStandalone) {
+  const Client client = clientWith(sessionInfo(7, 5));
+  EXPECT_TRUE(
+      logged(LogLevel::normal,
+             "updateCorrelatedSessions: Session 5 has no correlated sessions as it is a standalone session"));
+  EXPECT_EQ(agent_.hierarchyTokenCount(), 0U);
+  EXPECT_FALSE(parentID(client));
+  EXPECT_EQ(agent_.parentSessionForChild(*client.session), nullptr);
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*client.session), nullptr);
+}
+
+TEST_F(AgentHierarchy, JoinsTheAncestorsIdentifiersRootFirst) {
+  const Client a = clientWith(sessionInfoAt(0)), b = clientWith(sessionInfoAt(1)),
+               c = clientWith(sessionInfoAt(2));
+  const Client d = clientWith(sessionInfoAt(3, "T", 9));
+  EXPECT_EQ(parentID(d), id(a) + "." + id(b) + "." + id(c));
+  EXPECT_TRUE(logged(
+      LogLevel::debug,
+      "updateCorrelatedSessions: Adding session 9 to list for hierarchyToken T with hierarchyLevel 3"));
+  EXPECT_TRUE(
+      logged(LogLevel::debug, "parentSessionIDStringForSession: Checking hierarchyToken 'T' for session 9"));
+  EXPECT_EQ(agent_.parentSessionForChild(*d.session), c.session);
+}
+
+TEST_F(AgentHierarchy, AGapGivesThePartBelowIt) {
+  const Client a = clientWith(sessionInfoAt(0)), c = clientWith(sessionInfoAt(2)),
+               d = clientWith(sessionInfoAt(3));
+  EXPECT_EQ(parentID(d), id(c));
+  EXPECT_TRUE(logged(
+      LogLevel::normal,
+      "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '" +
+          id(c) + "'"));
+}
+
+TEST_F(AgentHierarchy, ALevelTwoSessionWithoutARootGetsItsParentsIDAndTheGapLine) {
+  const Client b = clientWith(sessionInfoAt(1)), c = clientWith(sessionInfoAt(2));
+  EXPECT_EQ(parentID(c), id(b));
+  EXPECT_TRUE(logged(LogLevel::normal, "incomplete parentSessionID is '" + id(b) + "'"));
+}
+
+TEST_F(AgentHierarchy, AGapRightAboveGivesNothing) {
+  const Client a = clientWith(sessionInfoAt(0)), c = clientWith(sessionInfoAt(2));
+  EXPECT_FALSE(parentID(c));
+  EXPECT_TRUE(logged(LogLevel::normal, "incomplete parentSessionID is '(null)'"));
+  EXPECT_EQ(agent_.parentSessionForChild(*c.session), nullptr);
+  EXPECT_TRUE(
+      logged(LogLevel::normal,
+             "parentSessionForChild: Unable to find session with hierarchy of 1 for hierarchyToken 'T'"));
+}
+
+TEST_F(AgentHierarchy, ATopSessionHasNoParentAndNoLine) {
+  const Client a = clientWith(sessionInfoAt(0));
+  test_.sink.clear();
+  EXPECT_FALSE(parentID(a));
+  EXPECT_TRUE(test_.sink.lines().empty());
+}
+
+TEST_F(AgentHierarchy, TheHighestLevelCostsNothing) {
+  const Client top = clientWith(sessionInfoAt(0)), deep = clientWith(sessionInfoAt(-1));
+  EXPECT_EQ(deep.session->hierarchyLevel(), 4294967295U);
+  EXPECT_FALSE(parentID(deep));
+  EXPECT_EQ(agent_.parentSessionForChild(*deep.session), nullptr);
+  top.session->setHasAggregator(true);
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*deep.session), top.session);
+}
+
+TEST_F(AgentHierarchy, AFirstSessionOfALevelIsTheOneFoundUntilItRegistersAgain) {
+  Client a = clientWith(sessionInfoAt(0)), b = clientWith(sessionInfoAt(0));
+  const Client child = clientWith(sessionInfoAt(1));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), a.session);
+  identify(a, sessionInfoAt(0));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), b.session) << "a moved to the end";
+}
+
+TEST_F(AgentHierarchy, RegisteringTwiceListsASessionOnce) {
+  Client a = clientWith(sessionInfoAt(0));
+  identify(a, sessionInfoAt(0));
+  a.connection->invalidateNow();
+  const Client child = clientWith(sessionInfoAt(1));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), nullptr);
+}
+
+TEST_F(AgentHierarchy, ANewTokenTakesTheSessionOutOfTheOldOne) {
+  Client a = clientWith(sessionInfoAt(0));
+  const Client child = clientWith(sessionInfoAt(1)), other = clientWith(sessionInfoAt(1, "U"));
+  identify(a, sessionInfoAt(0, "U"));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), nullptr);
+  EXPECT_EQ(agent_.parentSessionForChild(*other.session), a.session);
+  EXPECT_EQ(agent_.hierarchyTokenCount(), 2U);
+}
+
+TEST_F(AgentHierarchy, ASessionThatDropsItsTokenStaysRegisteredAsATopSession) {
+  Client a = clientWith(sessionInfoAt(3));
+  const Client child = clientWith(sessionInfoAt(1));
+  identify(a, sessionInfo());
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), a.session);
+  a.connection->invalidateNow();
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), nullptr) << "a session that ended is found nowhere";
+}
+
+TEST_F(AgentHierarchy, ASessionThatWasInvalidatedIsNotFound) {
+  const Client a = clientWith(sessionInfoAt(0)), b = clientWith(sessionInfoAt(1, "T", 8));
+  agent_.invalidateReportingSession(b.session);
+  EXPECT_FALSE(parentID(b));
+  EXPECT_TRUE(
+      logged(LogLevel::normal, "parentSessionIDStringForSession: Session 8 not found for hierarchyToken T"));
+  EXPECT_EQ(agent_.parentSessionForChild(*b.session), nullptr);
+  EXPECT_TRUE(
+      logged(LogLevel::error, "parentSessionForChild: ERROR: Session 8 not found for hierarchyToken T"));
+  agent_.invalidateReportingSession(a.session);
+  EXPECT_FALSE(parentID(b));
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "parentSessionIDStringForSession: ERROR: No sessions found for hierarchyToken T"));
+  EXPECT_EQ(agent_.parentSessionForChild(*b.session), nullptr);
+  EXPECT_TRUE(
+      logged(LogLevel::error, "parentSessionForChild: ERROR: No sessions found for hierarchyToken T"));
+}
+
+TEST_F(AgentHierarchy, TheRootMostAggregatorWins) {
+  const Client a = clientWith(sessionInfoAt(0), true), b = clientWith(sessionInfoAt(1), true);
+  const Client c = clientWith(sessionInfoAt(2));
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*c.session), a.session);
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*a.session), nullptr);
+  a.session->setHasAggregator(false);
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*c.session), b.session);
+}
+
+TEST_F(AgentHierarchy, OnlyTheFirstSessionOfALevelCountsAsAggregator) {
+  const Client first = clientWith(sessionInfoAt(0)), second = clientWith(sessionInfoAt(0), true);
+  const Client child = clientWith(sessionInfoAt(1));
+  EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*child.session), nullptr);
+}
+
+TEST_F(AgentHierarchy, AnUpdateShutsDownTheAggregationBeneathAnAggregator) {
+  const Client a = clientWith(sessionInfoAt(0), true), b = clientWith(sessionInfoAt(1, "T", 6), true);
+  agent_.updateDownstreamSessions(*a.session);
+  EXPECT_TRUE(a.session->hasAggregator());
+  EXPECT_FALSE(b.session->hasAggregator());
+  EXPECT_EQ(b.connection->messagesToClient().size(), 1U);
+  EXPECT_TRUE(logged(
+      LogLevel::debug,
+      "updateDownstreamSessions: Updating combined session ID and syncing reporting states for session 6"));
+}
+
+TEST_F(AgentHierarchy, AnUpdateBeneathAnAggregatorShutsDownTheSessionsOwnAggregation) {
+  const Client a = clientWith(sessionInfoAt(0), true), b = clientWith(sessionInfoAt(1), true);
+  const Client c = clientWith(sessionInfoAt(2), true);
+  agent_.updateDownstreamSessions(*b.session);
+  EXPECT_TRUE(a.session->hasAggregator());
+  EXPECT_FALSE(b.session->hasAggregator());
+  EXPECT_FALSE(c.session->hasAggregator()) << "b no longer aggregates, but a does";
+}
+
+TEST_F(AgentHierarchy, AnUpdateWithoutAnyAggregatorLeavesDeeperOnesAlone) {
+  const Client a = clientWith(sessionInfoAt(0)), b = clientWith(sessionInfoAt(1), true);
+  agent_.updateDownstreamSessions(*a.session);
+  EXPECT_TRUE(b.session->hasAggregator());
+}
+
+TEST_F(AgentHierarchy, ConfigurationBringsStatesAndCombinedIDsDown) {
+  Client child = clientWith(sessionInfoAt(1));
+  configure(child);
+  const auto childBackend = factory_.latest("httppost");
+  factory_.prepare = [](RecordingBackend& made) { made.stateAfterUpdate = kBackendStateDisabled; };
+  Client parent = clientWith(sessionInfoAt(0));
+  EXPECT_EQ(configure(parent), Array{});
+  EXPECT_EQ(childBackend->state(), kBackendStateDisabled);
+  EXPECT_EQ(childBackend->combinedSessionIDString(), String(id(parent) + "." + id(child)));
+}
+
+TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
+  test_.limits.maxHierarchyTokensPerUser = 2;
+  clientWith(sessionInfoAt(0, "A"));
+  clientWith(sessionInfoAt(0, "B"));
+  const Client refused = clientWith(sessionInfoAt(1, "C", 7));
+  EXPECT_FALSE(refused.session->hierarchyToken());
+  EXPECT_EQ(refused.session->hierarchyLevel(), 0U);
+  EXPECT_EQ(agent_.hierarchyTokenCount(), 2U);
+  EXPECT_EQ(test_.counters.value(Reason::hierarchyTokenRefused), 1U);
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "updateCorrelatedSessions: User 1000 has 2 hierarchy tokens, the most allowed: "
+                     "session 7 counts as standalone"));
+  clientWith(sessionInfoAt(1, "D"));
+  EXPECT_EQ(test_.sink.count(LogLevel::error, "the most allowed"), 1U) << "logged once a minute";
+  EXPECT_TRUE(clientWith(sessionInfoAt(1, "B")).session->hierarchyToken())
+      << "a token that exists may be joined";
+  EXPECT_TRUE(clientWith(sessionInfoAt(0, "E"), false, 1001).session->hierarchyToken()) << "another user's";
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,114 @@
+// Connections and the list of live sessions.
+#include "daemon/ReportingdAgent.h"
+
+#include "tests/daemon/AgentFixture.h"
+
+namespace kyt {
+namespace {
+
+class AgentConnections : public AgentFixture {};
+
+TEST_F(AgentConnections, AnEntitledConnectionGetsASession) {
+  const Client client = connect();
+  ASSERT_TRUE(client);
+  EXPECT_TRUE(client.connection->resumed());
+  EXPECT_EQ(agent_.sessionCount(), 1U);
+  EXPECT_TRUE(logged(
+      LogLevel::debug,
+      "listener: Accepting new VRP connection <connection> as it has proper entitlement, 0(0) connections."));
+  clientWith(sessionInfoAt(0));
+  connect();
+  EXPECT_TRUE(logged(LogLevel::debug, "as it has proper entitlement, 2(1) connections."));
+}
+
+TEST_F(AgentConnections, AConnectionWithoutTheEntitlementIsRefused) {
+  for (const Value& entitlement :
+       {Value(), Value(false), Value(0), Value("no"), Value(Dictionary{{"a", 1}})}) {
+    test_.sink.clear();
+    EXPECT_FALSE(connect(entitlement));
+    EXPECT_EQ(
+        test_.sink.lines(),
+        (std::vector<MemoryLogSink::Line>{
+            {LogLevel::debug,
+             "listener: new VRP connection <connection> does not have required kytreporting entitlement. Closing connection..."}}));
+  }
+  EXPECT_EQ(agent_.sessionCount(), 0U);
+  EXPECT_EQ(transaction_.begins(), 0);
+}
+
+TEST_F(AgentConnections, TheTransactionIsOpenWhileASessionIsListed) {
+  const Client first = connect();
+  EXPECT_TRUE(transaction_.isOpen());
+  const Client second = connect();
+  EXPECT_EQ(transaction_.begins(), 1);
+  first.connection->invalidateNow();
+  EXPECT_TRUE(transaction_.isOpen());
+  second.connection->invalidateNow();
+  EXPECT_FALSE(transaction_.isOpen());
+  EXPECT_EQ(transaction_.ends(), 1);
+  connect();
+  EXPECT_EQ(transaction_.begins(), 2);
+  EXPECT_FALSE(transaction_.outOfOrder());
+}
+
+TEST_F(AgentConnections, AnInterruptionAloneKeepsTheSession) {
+  const Client client = connect();
+  const std::string description = client.session->description();
+  client.connection->interruptNow();
+  EXPECT_EQ(agent_.sessionCount(), 1U);
+  EXPECT_TRUE(logged(LogLevel::debug, "listener: VRP connection to " + description + " was interrupted"));
+  EXPECT_FALSE(logged(LogLevel::debug, "was invalidated"));
+  client.connection->invalidateNow();
+  EXPECT_EQ(agent_.sessionCount(), 0U);
+  EXPECT_TRUE(logged(LogLevel::debug, "listener: VRP connection to " + description + " was invalidated"));
+}
+
+TEST_F(AgentConnections, AnInvalidationEndsTheSessionAfterItLeftTheList) {
+  Client client = clientWith(sessionInfo(7));
+  configure(client);
+  const auto backend = factory_.latest("httppost");
+  std::weak_ptr<ReportingdSession> session = client.session;
+  client.session.reset();
+  client.connection->invalidateNow();
+  ASSERT_EQ(backend->sent.size(), 2U);
+  EXPECT_EQ(backend->cleanupCount, 1);
+  const Dictionary& stop = *backend->sent[1].message.find("ClientData")->dictionary();
+  EXPECT_EQ(*stop.find("SessionsCount_QH"), Value(1)) << "counted once: it has left the list";
+  EXPECT_TRUE(session.expired());
+}
+
+TEST_F(AgentConnections, InvalidatingASessionThatIsNotListedChangesNothing) {
+  const Client client = connect();
+  client.connection->invalidateNow();
+  agent_.invalidateReportingSession(client.session);
+  EXPECT_EQ(agent_.sessionCount(), 0U);
+  EXPECT_FALSE(transaction_.outOfOrder());
+  const Client other = connect();
+  agent_.invalidateReportingSession(client.session);
+  EXPECT_EQ(agent_.sessionCount(), 1U);
+  EXPECT_TRUE(transaction_.isOpen());
+}
+
+TEST_F(AgentConnections, ATokensArrayAndSharedDataStayWhenItsSessionsHaveGone) {
+  Client first = clientWith(sessionInfoAt(0));
+  first.session->updateSharedDataWithDictionary(Dictionary{{"k", 1}});
+  first.connection->invalidateNow();
+  EXPECT_EQ(agent_.hierarchyTokenCount(), 1U);
+  Client second = clientWith(sessionInfoAt(0));
+  EXPECT_EQ(agent_.sharedDataForSession(*second.session), (Dictionary{{"k", 1}}));
+}
+
+TEST_F(AgentConnections, ShutDownRefusesNewConnectionsAndFinishesTheOthers) {
+  Client client = clientWith(sessionInfo());
+  configure(client);
+  EXPECT_FALSE(agent_.waitUntilSessionsHaveEnded(Duration(0)));
+  agent_.finishAllSessions();
+  test_.executor.runAll();
+  EXPECT_TRUE(agent_.waitUntilSessionsHaveEnded(std::chrono::seconds(10)));
+  EXPECT_TRUE(client.connection->invalidated());
+  EXPECT_EQ(factory_.latest("httppost")->cleanupCount, 1);
+  EXPECT_FALSE(connect());
+}
+
+}  // namespace
+}  // namespace kyt
