@@ -83,7 +83,7 @@ std::optional<Value> dateOf(std::string_view text) {
   using namespace std::chrono;
   const year_month_day day{year(static_cast<int>(part(0, 4))), month(part(5, 2)),
                            std::chrono::day(part(8, 2))};
-  if (!day.ok() || part(11, 2) > 23 || part(14, 2) > 59 || part(17, 2) > 60) return std::nullopt;
+  if (!day.ok() || part(11, 2) > 23 || part(14, 2) > 59 || part(17, 2) > 59) return std::nullopt;
   const auto time = sys_days(day) + hours(part(11, 2)) + minutes(part(14, 2)) + seconds(part(17, 2));
   return Value(Date{static_cast<double>(duration_cast<seconds>(time.time_since_epoch()).count())});
 }

@@ -10,6 +10,7 @@
 
 #include <charconv>
 #include <cmath>
+#include <cstdlib>
 #include <type_traits>
 #include <vector>
 
@@ -132,14 +133,28 @@ class Builder {
 
   bool Null() { return take(Value()); }
   bool Bool(bool truth) { return take(Value(truth)); }
-  bool Int(int number) { return take(Value(int64_t{number})); }
-  bool Uint(unsigned number) { return take(Value(int64_t{number})); }
-  bool Int64(int64_t number) { return take(Value(number)); }
-  bool Uint64(uint64_t number) {
-    return take(number <= INT64_MAX ? Value(static_cast<int64_t>(number)) : Value(number));
+  // Numbers come as their text: the reader's own conversion of some ("0e47") is undefined.
+  bool RawNumber(const char* text, rapidjson::SizeType length, bool) {
+    const char* end = text + length;
+    if (std::string_view(text, length).find_first_of(".eE") == std::string_view::npos) {
+      int64_t integer = 0;
+      if (std::from_chars(text, end, integer).ec == std::errc()) return take(Value(integer));
+      uint64_t large = 0;
+      if (*text != '-' && std::from_chars(text, end, large).ec == std::errc()) return take(Value(large));
+    }
+    double number = 0;
+    if (std::from_chars(text, end, number).ec == std::errc()) return take(Value(number));
+    // Too near to zero for a double is zero or nearly so; too far from it is an error.
+    number = std::strtod(std::string(text, length).c_str(), nullptr);
+    if (std::isfinite(number)) return take(Value(number));
+    error_ = "Number too big to be stored in double.";
+    return false;
   }
-  bool Double(double number) { return take(Value(number)); }
-  bool RawNumber(const char*, rapidjson::SizeType, bool) { return false; }  // is not asked for
+  bool Int(int) { return false; }  // this and the next four are never asked for
+  bool Uint(unsigned) { return false; }
+  bool Int64(int64_t) { return false; }
+  bool Uint64(uint64_t) { return false; }
+  bool Double(double) { return false; }
   bool String(const char* text, rapidjson::SizeType length, bool) {
     return take(Value(std::string_view(text, length)));
   }
@@ -152,7 +167,8 @@ class Builder {
   bool EndObject(rapidjson::SizeType) { return end(); }
   bool EndArray(rapidjson::SizeType) { return end(); }
 
-  [[nodiscard]] bool tooDeep() const { return tooDeep_; }
+  // Why this ended the parse, or null.
+  [[nodiscard]] const char* error() const { return error_; }
   [[nodiscard]] Value& root() { return root_; }
 
  private:
@@ -172,9 +188,12 @@ class Builder {
     return true;
   }
   bool start(Value container) {
-    tooDeep_ = open_.size() >= static_cast<size_t>(Limits::maxObjectDepth);
-    if (!tooDeep_) open_.push_back({std::move(container), {}});
-    return !tooDeep_;
+    if (open_.size() >= static_cast<size_t>(Limits::maxObjectDepth)) {
+      error_ = "Containers are nested too deep.";
+      return false;
+    }
+    open_.push_back({std::move(container), {}});
+    return true;
   }
   bool end() {
     Value value = std::move(open_.back().value);
@@ -184,7 +203,7 @@ class Builder {
 
   std::vector<Container> open_;
   Value root_;
-  bool tooDeep_ = false;
+  const char* error_ = nullptr;
 };
 
 Error errorAt(size_t offset, int code, const char* what) {
@@ -209,10 +228,9 @@ std::variant<Value, Error> RapidJSONWriter::parse(std::string_view text) {
   rapidjson::EncodedInputStream<rapidjson::UTF8<>, rapidjson::MemoryStream> stream(bytes);
   rapidjson::Reader reader;
   Builder builder;
-  const rapidjson::ParseResult result =
-      reader.Parse<rapidjson::kParseValidateEncodingFlag | rapidjson::kParseFullPrecisionFlag>(stream,
-                                                                                               builder);
-  if (builder.tooDeep()) return errorAt(result.Offset(), -1, "Containers are nested too deep.");
+  constexpr unsigned kOptions = rapidjson::kParseValidateEncodingFlag | rapidjson::kParseNumbersAsStringsFlag;
+  const rapidjson::ParseResult result = reader.Parse<kOptions>(stream, builder);
+  if (builder.error() != nullptr) return errorAt(result.Offset(), -1, builder.error());
   if (result.IsError())
     return errorAt(result.Offset(), result.Code(), rapidjson::GetParseError_En(result.Code()));
   return std::move(builder.root());

@@ -13,7 +13,8 @@ class RapidJSONWriter : public JSON {
   void writeCompact(const Value& value, std::string& out) override;
   void writePretty(const Value& value, std::string& out) override;
   // Whole numbers become integers, or unsigned ones above the signed range; others doubles. Of equal keys the
-  // last wins. An error's code is RapidJSON's, or -1 for containers nested too deep.
+  // last wins. An error's code is RapidJSON's, or -1 for what this class refuses: containers nested too
+  // deep, numbers too large.
   [[nodiscard]] std::variant<Value, Error> parse(std::string_view text) override;
 };
 

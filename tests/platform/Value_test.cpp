@@ -71,13 +71,13 @@ TEST(String, CountsUTF16UnitsAndMalformedBytesAsOneEach) {
 }
 
 TEST(String, OfPermanentTextSharesItsBlockWithoutCounting) {
-  const String key = String::permanent("a key of more than fifteen bytes");
+  static const String key = String::permanent("a key of more than fifteen bytes");
   {
     const String copy(key);
     EXPECT_EQ(copy.block(), key.block());
   }
   EXPECT_EQ(key, "a key of more than fifteen bytes");
-  EXPECT_EQ(String::permanent("short"), "short");
+  EXPECT_EQ(String::permanent("short"), "short");  // lives inside, like every short text
 }
 
 TEST(Data, HoldsBytesAndMayBeCut) {
@@ -276,12 +276,12 @@ TEST(Value, ReleasesTheDeepestObjectThatTheWireAllows) {
 }
 
 TEST(Value, SharesBlocksBetweenThreads) {
-  const String constant = String::permanent("a permanent key of some length");
+  static const String constant = String::permanent("a permanent key of some length");
   Dictionary shared{
       {"text", repeated(40)}, {"list", Array{1, repeated(20), 3}}, {constant, Dictionary{{"a", 1}}}};
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([own = shared, constant, t]() mutable {
+    threads.emplace_back([own = shared, t]() mutable {
       for (int i = 0; i < 2000; ++i) {
         Dictionary copy(own);
         copy.set("thread", t);

@@ -87,8 +87,8 @@ TEST(PropertyLists, ReadDatesOfTheCalendar) {
   EXPECT_EQ(parsed("<date>1970-01-01T00:00:00Z</date>").date(), Date{0});
   EXPECT_EQ(parsed("<date>2024-02-29T23:59:59Z</date>").date(), Date{1709251199});
   for (const char* text :
-       {"", "2023-02-29T00:00:00Z", "2024-13-01T00:00:00Z", "2024-01-01T24:00:00Z", "2024-01-01T00:00:00",
-        "2024-01-01 00:00:00Z", "2024-01-01T00:00:00+01:00", "20x4-01-01T00:00:00Z"})
+       {"", "2023-02-29T00:00:00Z", "2024-13-01T00:00:00Z", "2024-01-01T24:00:00Z", "2024-01-01T00:00:60Z",
+        "2024-01-01T00:00:00", "2024-01-01 00:00:00Z", "2024-01-01T00:00:00+01:00", "20x4-01-01T00:00:00Z"})
     EXPECT_EQ(errorIn("<date>" + std::string(text) + "</date>"),
               "The element \"date\" holds no such value (offset 8)");
 }

@@ -117,7 +117,11 @@ TEST(JSON, ReadsNumbersWithTheirKind) {
   EXPECT_EQ(parsed("9223372036854775807").integer(), INT64_MAX);
   EXPECT_EQ(parsed("18446744073709551615").unsignedInteger(), UINT64_MAX);
   EXPECT_EQ(parsed("18446744073709551616").real(), 18446744073709551616.0);
+  EXPECT_EQ(parsed("-9223372036854775809").real(), -9223372036854775808.0);
   EXPECT_EQ(parsed("1.0").real(), 1.0);
+  EXPECT_EQ(parsed("0e47").real(), 0);  // undefined in RapidJSON's own conversion
+  EXPECT_EQ(parsed("1e-999").real(), 0);
+  EXPECT_EQ(parsed("5e-324").real(), 5e-324);
 }
 
 TEST(JSON, ReadsBackWhatItWrote) {
@@ -132,6 +136,7 @@ TEST(JSON, LetsTheLastOfEqualKeysWin) {
 }
 
 TEST(JSON, RefusesWhatIsNoJSONAndSaysWhere) {
+  EXPECT_EQ(errorOf("[1e999]"), "Number too big to be stored in double. (offset 1)");
   EXPECT_EQ(errorOf("[1,"), "Invalid value. (offset 3)");
   EXPECT_EQ(errorOf(""), "The document is empty. (offset 0)");
   for (std::string_view text :

@@ -1,0 +1,191 @@
+// The objects on the road of one event: building a record of 26 keys and about 600 bytes, copying it,
+// changing the copy, and writing it as JSON. References for the same work stand beside: RapidJSON's document
+// for building and copying, and RapidJSON's own writer over a finished document for JSON.
+#include <benchmark/benchmark.h>
+#include <rapidjson/document.h>
+#include <rapidjson/stringbuffer.h>
+#include <rapidjson/writer.h>
+
+#include <array>
+#include <string>
+#include <vector>
+
+#include "platform/Value.h"
+#include "platform/linux/RapidJSONWriter.h"
+
+namespace kyt {
+namespace {
+
+constexpr std::array<const char*, 16> kTextKeys = {
+    "_sender",        "_method",      "_deviceType",    "_osVersion",        "_build",    "_clientVersion",
+    "_correlationID", "_sessionUUID", "networkID",      "connection",        "codecName", "relayAddress",
+    "endReason",      "transport",    "experimentName", "remoteBuildVersion"};
+constexpr std::array<const char*, 10> kNumberKeys = {"_eventNumber", "_eventTime",  "_respCode", "bitrate",
+                                                     "lossRate",     "roundTrip",   "frames",    "stalls",
+                                                     "jitterMax",    "batteryLevel"};
+
+std::string textOf(size_t i) {
+  static constexpr const char* kTexts[] = {"QH",
+                                           "17",
+                                           "Model14,2",
+                                           "17.4.1",
+                                           "21E236",
+                                           "5",
+                                           "Zm9vYmFyYmF6MTIzNDU2Nw==:Zm9vYmFy",
+                                           "Zm9vYmFyYmF6MTIzNDU2Nw==",
+                                           "wifi-5GHz",
+                                           "direct",
+                                           "hevc",
+                                           "192.0.2.17",
+                                           "local-hangup",
+                                           "udp",
+                                           "baseline-v2",
+                                           "21E5195e"};
+  return kTexts[i];
+}
+
+const std::array<String, 16>& textKeys() {
+  static const std::array<String, 16> keys = [] {
+    std::array<String, 16> made;
+    for (size_t i = 0; i < made.size(); ++i) made[i] = String::permanent(kTextKeys[i]);
+    return made;
+  }();
+  return keys;
+}
+
+const std::array<String, 10>& numberKeys() {
+  static const std::array<String, 10> keys = [] {
+    std::array<String, 10> made;
+    for (size_t i = 0; i < made.size(); ++i) made[i] = String::permanent(kNumberKeys[i]);
+    return made;
+  }();
+  return keys;
+}
+
+// As a back end does it: keys and most texts are there already, numbers come with the event.
+Dictionary record(const std::array<Value, 16>& texts, int64_t number) {
+  Dictionary made;
+  made.reserve(26);
+  for (size_t i = 0; i < texts.size(); ++i) made.set(textKeys()[i], texts[i]);
+  for (size_t i = 0; i < 8; ++i) made.set(numberKeys()[i], number + static_cast<int64_t>(i) * 1000);
+  made.set(numberKeys()[8], 0.125 * static_cast<double>(number));
+  made.set(numberKeys()[9], 1769860800.123456);
+  return made;
+}
+
+std::array<Value, 16> texts() {
+  std::array<Value, 16> made;
+  for (size_t i = 0; i < made.size(); ++i) made[i] = textOf(i);
+  return made;
+}
+
+rapidjson::Document document() {
+  rapidjson::Document made(rapidjson::kObjectType);
+  auto& allocator = made.GetAllocator();
+  for (size_t i = 0; i < 16; ++i)
+    made.AddMember(rapidjson::StringRef(kTextKeys[i]), rapidjson::Value(textOf(i).c_str(), allocator),
+                   allocator);
+  for (size_t i = 0; i < 8; ++i)
+    made.AddMember(rapidjson::StringRef(kNumberKeys[i]), static_cast<int64_t>(1 + i * 1000), allocator);
+  made.AddMember(rapidjson::StringRef(kNumberKeys[8]), 0.125, allocator);
+  made.AddMember(rapidjson::StringRef(kNumberKeys[9]), 1769860800.123456, allocator);
+  return made;
+}
+
+void BuildRecord(benchmark::State& state) {
+  const auto ready = texts();
+  int64_t number = 0;
+  for (auto _ : state) {
+    Dictionary made = record(ready, ++number);
+    benchmark::DoNotOptimize(made);
+  }
+}
+BENCHMARK(BuildRecord);
+
+void BuildRecordReferenceDocument(benchmark::State& state) {
+  for (auto _ : state) {
+    rapidjson::Document made = document();
+    benchmark::DoNotOptimize(made);
+  }
+}
+BENCHMARK(BuildRecordReferenceDocument);
+
+void CopyRecord(benchmark::State& state) {
+  const Dictionary made = record(texts(), 1);
+  for (auto _ : state) {
+    Dictionary copy(made);
+    benchmark::DoNotOptimize(copy);
+  }
+}
+BENCHMARK(CopyRecord)->Threads(1)->Threads(4);
+
+void ChangeCopyOfRecord(benchmark::State& state) {
+  const Dictionary made = record(texts(), 1);
+  for (auto _ : state) {
+    Dictionary copy(made);
+    copy.set(numberKeys()[0], 2);
+    benchmark::DoNotOptimize(copy);
+  }
+}
+BENCHMARK(ChangeCopyOfRecord);
+
+void CopyReferenceDocument(benchmark::State& state) {
+  const rapidjson::Document made = document();
+  for (auto _ : state) {
+    rapidjson::Document copy;
+    copy.CopyFrom(made, copy.GetAllocator());
+    benchmark::DoNotOptimize(copy);
+  }
+}
+BENCHMARK(CopyReferenceDocument);
+
+void FindEveryKey(benchmark::State& state) {
+  const Dictionary made = record(texts(), 1);
+  for (auto _ : state)
+    for (const DictionaryEntry& entry : made) benchmark::DoNotOptimize(made.find(entry.key));
+  state.SetItemsProcessed(static_cast<int64_t>(state.iterations()) * 26);
+}
+BENCHMARK(FindEveryKey);
+
+void WriteJSON(benchmark::State& state) {
+  const Value made(record(texts(), 1));
+  RapidJSONWriter json;
+  std::string out;
+  for (auto _ : state) {
+    out.clear();
+    json.writeCompact(made, out);
+    benchmark::DoNotOptimize(out.data());
+  }
+  state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * out.size()));
+  state.counters["bytes"] = static_cast<double>(out.size());
+}
+BENCHMARK(WriteJSON);
+
+void WriteJSONReferenceWriter(benchmark::State& state) {
+  const rapidjson::Document made = document();
+  rapidjson::StringBuffer buffer;
+  for (auto _ : state) {
+    buffer.Clear();
+    rapidjson::Writer<rapidjson::StringBuffer> writer(buffer);
+    made.Accept(writer);
+    benchmark::DoNotOptimize(buffer.GetString());
+  }
+  state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * buffer.GetSize()));
+  state.counters["bytes"] = static_cast<double>(buffer.GetSize());
+}
+BENCHMARK(WriteJSONReferenceWriter);
+
+void SetManyKeys(benchmark::State& state) {
+  std::vector<String> keys;
+  for (int64_t i = 0; i < state.range(0); ++i) keys.emplace_back("hostile key " + std::to_string(i));
+  for (auto _ : state) {
+    Dictionary made;
+    for (const String& key : keys) made.set(key, 1);
+    benchmark::DoNotOptimize(made);
+  }
+  state.SetItemsProcessed(static_cast<int64_t>(state.iterations()) * state.range(0));
+}
+BENCHMARK(SetManyKeys)->Arg(32)->Arg(1000)->Arg(60000);
+
+}  // namespace
+}  // namespace kyt
