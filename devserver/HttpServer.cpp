@@ -189,7 +189,9 @@ std::unique_ptr<HttpServer> HttpServer::start(const Options& options, uint16_t p
   const int listener = listenOn(options.listen, port, error);
   if (listener < 0) return nullptr;
   std::unique_ptr<HttpServer> server(new HttpServer(options, identity != nullptr, handler, suspensions));
-  unsigned flags = MHD_USE_EPOLL_INTERNAL_THREAD | MHD_ALLOW_SUSPEND_RESUME;
+  // With epoll the library overlooks the end of a connection that came together with its last bytes, until
+  // the time-out; poll sees it at once, and suspended connections are not among those it asks about.
+  unsigned flags = MHD_USE_POLL_INTERNAL_THREAD | MHD_ALLOW_SUSPEND_RESUME;
   if (identity != nullptr) flags |= MHD_USE_TLS;
   std::vector<MHD_OptionItem> tls;
   if (identity != nullptr) {

@@ -1,5 +1,6 @@
 // One port: HTTP, or HTTPS when an identity is given. Speaks the protocol through libmicrohttpd, with a small
-// pool of threads that each wait in epoll; a request that waits is suspended and occupies none of them.
+// pool of threads that each poll their share of the connections; a request that waits is suspended and
+// occupies none of them.
 #pragma once
 
 #include <microhttpd.h>

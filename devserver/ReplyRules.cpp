@@ -69,7 +69,8 @@ std::variant<ReplyRule, std::string> ReplyRules::parse(const std::string& json) 
   }
   if (!document.IsObject()) return "the rule is no JSON object";
   ReplyRule rule;
-  for (const auto& member : document.GetObject()) {
+  const rapidjson::Value& members = document;
+  for (const auto& member : members.GetObject()) {
     if (!readMember(textOf(member.name), member.value, rule)) {
       return "\"" + printable(textOf(member.name)) + "\" is unknown or has a value that does not fit";
     }
