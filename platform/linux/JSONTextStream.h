@@ -49,18 +49,27 @@ class JSONTextStream {
 
   // The text in quotation marks, escaped as RapidJSON escapes.
   void appendQuoted(std::string_view text) {
-    Put('"');
-    while (text.size() > kPiece) {
-      appendEscaped(text.data(), text.data() + kPiece);
-      text.remove_prefix(kPiece);
+    if (text.size() <= kPiece) [[likely]] {
+      char* to = room(6 * text.size() + kSlack);
+      *to++ = '"';
+      to = escaped(to, text.data(), text.size());
+      *to++ = '"';
+      next_ = to;
+      return;
     }
-    appendEscaped(text.data(), text.data() + text.size());
+    Put('"');
+    for (; text.size() > kPiece; text.remove_prefix(kPiece))
+      next_ = escaped(room(kSize), text.data(), kPiece);
+    next_ = escaped(room(kSize), text.data(), text.size());
     Put('"');
   }
 
  private:
   static constexpr size_t kSize = 4096;
-  static constexpr size_t kPiece = (kSize - 16) / 6;  // of a text: at most six characters are written for one
+  static constexpr size_t kSlack =
+      16;  // for the quotation marks, and since short ends are written as whole words
+  static constexpr size_t kPiece =
+      (kSize - kSlack) / 6;  // of a text: at most six characters are written for one
 
   // Whether one of eight characters must be escaped: below a blank, a quotation mark or a backslash.
   static bool anyEscaped(uint64_t word) {
@@ -71,18 +80,62 @@ class JSONTextStream {
     return (control | hasZero(word ^ kOnes * '"') | hasZero(word ^ kOnes * '\\')) != 0;
   }
 
-  void appendEscaped(const char* from, const char* end) {
-    char* to = room(kPiece * 6);
+  static uint64_t load64(const char* from) {
+    uint64_t word;
+    std::memcpy(&word, from, sizeof word);
+    return word;
+  }
+
+  // Writes the text and answers the end. It is copied by words as long as nothing in them is escaped; the
+  // last word overlaps the one before, and a text shorter than a word is put together from overlapping
+  // pieces.
+  static char* escaped(char* to, const char* from, size_t size) {
+    const char* const end = from + size;
+    if (size < 8)
+      return std::endian::native == std::endian::little ? shortText(to, from, size) : slowly(to, from, end);
+    for (; end - from >= 8; from += 8, to += 8) {
+      const uint64_t word = load64(from);
+      if (anyEscaped(word)) return slowly(to, from, end);
+      std::memcpy(to, &word, 8);
+    }
+    if (from == end) return to;
+    const uint64_t last = load64(end - 8);
+    if (anyEscaped(last)) return slowly(to, from, end);
+    to += end - from;
+    std::memcpy(to - 8, &last, 8);
+    return to;
+  }
+
+  static char* shortText(char* to, const char* from, size_t size) {
+    if (size == 0) return to;
+    uint64_t word = ~uint64_t{0} << (8 * size);  // above the text, characters that are never escaped
+    if (size >= 4) {
+      uint32_t low;
+      uint32_t high;
+      std::memcpy(&low, from, 4);
+      std::memcpy(&high, from + size - 4, 4);
+      word |= low | static_cast<uint64_t>(high) << (8 * (size - 4));
+    } else {
+      const auto at = [from](size_t i) {
+        return static_cast<uint64_t>(static_cast<unsigned char>(from[i])) << (8 * i);
+      };
+      word |= at(0) | at(size / 2) | at(size - 1);
+    }
+    if (anyEscaped(word)) return slowly(to, from, from + size);
+    std::memcpy(to, &word, 8);
+    return to + size;
+  }
+
+  static char* slowly(char* to, const char* from, const char* end) {
     while (from != end) {
-      for (uint64_t word; end - from >= 8; from += 8, to += 8) {
-        std::memcpy(&word, from, 8);
+      for (int i = 0; i < 8 && from != end; ++i) to = appendCharacter(to, *from++);
+      for (; end - from >= 8; from += 8, to += 8) {
+        const uint64_t word = load64(from);
         if (anyEscaped(word)) break;
         std::memcpy(to, &word, 8);
       }
-      // Eight at most one by one, then words again.
-      for (int i = 0; i < 8 && from != end; ++i) to = appendCharacter(to, *from++);
     }
-    next_ = to;
+    return to;
   }
 
   static char* appendCharacter(char* to, char c) {
