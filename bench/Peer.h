@@ -1,0 +1,39 @@
+// A client of the daemon in its cheapest form: a socket and bytes prepared beforehand, so that a benchmark's
+// load costs little beside what it measures.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace kyt::bench {
+
+class Peer {
+ public:
+  Peer() = default;
+  Peer(Peer&& other) noexcept;
+  Peer& operator=(Peer&& other) noexcept;
+  ~Peer();
+  // Connected, identified and configured; none when the daemon refuses or answers no live back end.
+  [[nodiscard]] static std::optional<Peer> open(const std::string& socketPath, uint32_t sessionID);
+  // All of it; blocks while the daemon does not read.
+  [[nodiscard]] bool send(std::string_view bytes);
+  // A call of Peer.Ping and its reply: everything sent before has been handled. Blocks.
+  [[nodiscard]] bool ping();
+
+ private:
+  [[nodiscard]] bool awaitReply(uint32_t serial);
+  int fd_ = -1;
+  std::string in_;
+};
+
+// What the kernel says of a process.
+struct ProcessFigures {
+  double processorSeconds = 0;
+  uint64_t anonymousBytes = 0, residentBytes = 0;
+  uint64_t switches = 0;  // voluntary context switches of all its threads
+};
+[[nodiscard]] ProcessFigures figuresOf(int pid);
+
+}  // namespace kyt::bench
