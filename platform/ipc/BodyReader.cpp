@@ -571,6 +571,10 @@ bool BodyReader::endOfOptional(const uint8_t* end) {
   return endOfArray(cursor_, end);
 }
 
+void BodyReader::refuse(const char* problem) {
+  invalid(cursor_, problem);
+}
+
 BodyStatus BodyReader::finish() {
   if (cursor_.status == BodyStatus::ok && cursor_.at != cursor_.end) {
     malformed(cursor_, "bytes follow the last argument");

@@ -60,6 +60,9 @@ class BodyReader {
   bool readOptionalError(std::optional<Error>& out);            // a(sis), none or one
   bool readDescriptorIndexes(std::vector<uint32_t>& out);       // ah
 
+  // The caller's own objection to arguments that are whole.
+  void refuse(const char* problem);
+
   // Everything was read, and nothing is left over. Otherwise whose fault it is.
   [[nodiscard]] BodyStatus finish();
   // After a status other than ok: what was wrong, for the error reply and the log.

@@ -1,0 +1,170 @@
+#include "platform/ipc/ConnectionOutput.h"
+
+#include <utility>
+
+namespace kyt {
+namespace {
+
+constexpr size_t kMostHeldBytes = 65536;  // a turn's replies beyond that do not wait for its end
+
+}  // namespace
+
+ConnectionOutput::Sent ConnectionOutput::send(Builder build, bool droppable) {
+  Event event = Event::none;
+  {
+    MutexLock lock(mutex_);
+    if (stream_ == nullptr || dead_) return Sent::closed;
+    const size_t before = pending_.size();
+    if (++lastSerial_ == 0) ++lastSerial_;
+    MessageWriter writer(pending_);
+    if (!build(writer, lastSerial_)) return Sent::refused;
+    if (droppable && pending_.size() - written_ > maxQueuedBytes_) {
+      pending_.resize(before);
+      return Sent::queueFull;
+    }
+    event = queued();
+  }
+  tell(event);
+  return Sent::yes;
+}
+
+void ConnectionOutput::sendRaw(std::string_view bytes) {
+  Event event = Event::none;
+  {
+    MutexLock lock(mutex_);
+    if (stream_ == nullptr || dead_) return;
+    pending_.append(bytes);
+    event = queued();
+  }
+  tell(event);
+}
+
+ConnectionOutput::Event ConnectionOutput::queued() {
+  Event event = Event::none;
+  if (!waiting_ && (!held_ || pending_.size() - written_ >= kMostHeldBytes)) event = flush();
+  const size_t left = pending_.size() - written_;
+  if (event == Event::broken || left <= maxQueuedBytes_) return event;
+  if (left > 2 * maxQueuedBytes_) {
+    dead_ = true;
+    pending_ = std::string();
+    written_ = 0;
+    return Event::overflowed;
+  }
+  if (paused_) return event;
+  paused_ = true;
+  return event == Event::needsRoom ? Event::pausedAndNeedsRoom : Event::paused;
+}
+
+ConnectionOutput::Event ConnectionOutput::flush() {
+  while (written_ < pending_.size()) {
+    const StreamResult result = stream_->write(std::string_view(pending_).substr(written_));
+    if (result.status == StreamStatus::wouldBlock) {
+      if (written_ > pending_.size() / 2) {
+        pending_.erase(0, written_);
+        written_ = 0;
+      }
+      const bool mayGoOn = paused_ && pending_.size() - written_ <= maxQueuedBytes_ / 2;
+      if (mayGoOn) paused_ = false;
+      if (waiting_) return mayGoOn ? Event::drainedAndNeedsRoom : Event::needsRoom;
+      waiting_ = true;
+      return Event::needsRoom;
+    }
+    if (result.status != StreamStatus::ok) {
+      dead_ = true;
+      pending_ = std::string();
+      written_ = 0;
+      return Event::broken;
+    }
+    written_ += result.bytes;
+  }
+  pending_ = std::string();  // an idle connection holds no buffer
+  written_ = 0;
+  const bool tellDrained = std::exchange(paused_, false) || (finishing_ && waiting_);
+  waiting_ = false;
+  return tellDrained ? Event::drained : Event::none;
+}
+
+void ConnectionOutput::tell(Event event) {
+  if (event == Event::none) return;
+  const std::shared_ptr<Observer> observer = observer_.lock();
+  if (!observer) return;
+  switch (event) {
+    case Event::none:
+      break;
+    case Event::needsRoom:
+      observer->outputNeedsRoom();
+      break;
+    case Event::pausedAndNeedsRoom:
+      observer->outputPaused();
+      observer->outputNeedsRoom();
+      break;
+    case Event::paused:
+      observer->outputPaused();
+      break;
+    case Event::drainedAndNeedsRoom:
+      observer->outputDrained();
+      observer->outputNeedsRoom();
+      break;
+    case Event::drained:
+      observer->outputDrained();
+      break;
+    case Event::overflowed:
+      observer->outputOverflowed();
+      break;
+    case Event::broken:
+      observer->outputBroken();
+      break;
+  }
+}
+
+void ConnectionOutput::hold() {
+  MutexLock lock(mutex_);
+  held_ = true;
+}
+
+void ConnectionOutput::release() {
+  Event event = Event::none;
+  {
+    MutexLock lock(mutex_);
+    held_ = false;
+    if (stream_ != nullptr && !dead_ && !waiting_) event = flush();
+  }
+  tell(event);
+}
+
+void ConnectionOutput::writable() {
+  Event event = Event::none;
+  {
+    MutexLock lock(mutex_);
+    if (stream_ != nullptr && !dead_ && waiting_) event = flush();
+  }
+  tell(event);
+}
+
+bool ConnectionOutput::paused() const {
+  MutexLock lock(mutex_);
+  return paused_;
+}
+
+bool ConnectionOutput::finish() {
+  Event event = Event::none;
+  bool written = false;
+  {
+    MutexLock lock(mutex_);
+    finishing_ = true;
+    held_ = false;
+    if (stream_ != nullptr && !dead_ && !waiting_) event = flush();
+    written = stream_ == nullptr || dead_ || pending_.empty();
+  }
+  if (!written) tell(event);
+  return written;
+}
+
+void ConnectionOutput::close() {
+  MutexLock lock(mutex_);
+  stream_ = nullptr;
+  pending_ = std::string();
+  written_ = 0;
+}
+
+}  // namespace kyt

@@ -1,0 +1,88 @@
+// What the daemon sends on one connection: replies and one-way calls, queued under a lock of its own and
+// written by whoever queued them or, when the socket had no room, by the reactor.
+//
+// A turn of the connection gathers its replies (hold() … release()), so that they leave in one write; they
+// leave earlier when the turn is about to block. What waits is limited: past `maxQueuedBytes` the connection
+// stops reading from its client until half of it is gone; past twice that it ends. Callable from any thread;
+// never blocks.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "platform/Function.h"
+#include "platform/Mutex.h"
+#include "platform/ipc/MessageWriter.h"
+#include "platform/ipc/Stream.h"
+
+namespace kyt {
+
+class ConnectionOutput {
+ public:
+  // What the connection is told; called without the lock, from whatever thread the change happened on.
+  class Observer {
+   public:
+    virtual ~Observer() = default;
+    virtual void outputNeedsRoom() = 0;   // tell the output (writable()) when the socket takes bytes again
+    virtual void outputPaused() = 0;      // past the limit: reading stops
+    virtual void outputDrained() = 0;     // reading may go on; after finish(): everything is written
+    virtual void outputOverflowed() = 0;  // past twice the limit: the connection ends
+    virtual void outputBroken() = 0;      // the socket is broken
+  };
+
+  // `stream` is used until close().
+  ConnectionOutput(Stream& stream, std::weak_ptr<Observer> observer, uint64_t maxQueuedBytes)
+      : stream_(&stream), observer_(std::move(observer)), maxQueuedBytes_(maxQueuedBytes) {}
+
+  // Writes one whole message; answers what the writer's end() said.
+  using Builder = Function<bool(MessageWriter&, uint32_t serial)>;
+  enum class Sent : uint8_t {
+    yes,
+    closed,     // nobody is there any more
+    refused,    // it cannot be written as a message: too long, or nested too deeply
+    queueFull,  // `droppable`, and it would have passed the limit
+  };
+  Sent send(Builder build, bool droppable = false);
+  // Bytes that are no message: the handshake's.
+  void sendRaw(std::string_view bytes);
+
+  void hold();
+  void release();  // and writes
+  void writable();
+  [[nodiscard]] bool paused() const;
+  // Whether everything is written; otherwise outputDrained() follows when it is, or outputBroken().
+  [[nodiscard]] bool finish();
+  // The stream is not touched any more when this returns.
+  void close();
+
+ private:
+  enum class Event : uint8_t {
+    none,
+    needsRoom,
+    paused,
+    pausedAndNeedsRoom,
+    drained,
+    drainedAndNeedsRoom,
+    overflowed,
+    broken
+  };
+  Event flush() REQUIRES(mutex_);
+  Event queued() REQUIRES(mutex_);
+  void tell(Event event);
+
+  mutable Mutex mutex_;
+  Stream* stream_ GUARDED_BY(mutex_);
+  const std::weak_ptr<Observer> observer_;
+  const uint64_t maxQueuedBytes_;
+  std::string pending_ GUARDED_BY(mutex_);
+  size_t written_ GUARDED_BY(mutex_) = 0;  // of pending_
+  uint32_t lastSerial_ GUARDED_BY(mutex_) = 0;
+  bool held_ GUARDED_BY(mutex_) = false;
+  bool waiting_ GUARDED_BY(mutex_) = false;  // for room
+  bool paused_ GUARDED_BY(mutex_) = false;
+  bool finishing_ GUARDED_BY(mutex_) = false;
+  bool dead_ GUARDED_BY(mutex_) = false;  // broken or overflowed: nothing is sent any more
+};
+
+}  // namespace kyt

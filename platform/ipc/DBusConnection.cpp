@@ -1,0 +1,262 @@
+#include "platform/ipc/DBusConnection.h"
+
+#include <cstdio>
+#include <cstring>
+#include <utility>
+
+#include "platform/Clock.h"
+#include "platform/Entitlements.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+
+namespace kyt {
+
+DBusConnection::DBusConnection(std::shared_ptr<ServerContext> context, std::unique_ptr<Stream> stream,
+                               PeerCredentials peer, uint64_t number)
+    : context_(std::move(context)),
+      number_(number),
+      user_(peer.uid),
+      process_(peer.pid),
+      queue_(SerialQueue::create("kyt.connection", context_->services.executor, uint64_t{peer.uid} + 1)),
+      stream_(std::move(stream)),
+      peer_(std::make_unique<PeerCredentials>(std::move(peer))) {}
+
+DBusConnection::~DBusConnection() = default;
+
+void DBusConnection::offer(Listener& listener, ListenerDelegate& delegate) {
+  const std::shared_ptr<ConnectionOutput::Observer> observer(shared_from_this(), this);
+  output_ = std::make_shared<ConnectionOutput>(*stream_, observer, context_->services.limits.maxQueuedBytes);
+  queue_->async([self = shared_from_this(), &listener, &delegate] {
+    if (self->ended_ || self->closed()) return;
+    const bool accepted = delegate.listenerShouldAcceptNewConnection(listener, self);
+    self->peer_.reset();
+    if (!accepted) self->context_->services.counters.add(Reason::unentitledConnection);
+    if (accepted && self->resumed_ && self->exportedObject_) {
+      self->start();
+    } else {
+      self->end(false, false);
+    }
+  });
+}
+
+void DBusConnection::start() {
+  started_ = true;
+  handshake_ = std::make_unique<ServerHandshake>(user_, context_->services.machineId);
+  const auto patience =
+      std::chrono::duration_cast<Duration>(std::chrono::duration<double>(Limits::handshakeSeconds));
+  handshakeTimer_ = context_->services.timers.after(patience, queue_, [weak = weak_from_this()] {
+    const auto self = weak.lock();
+    if (!self || !self->handshake_ || self->ended_) return;
+    self->breakOff(Reason::handshakeTimedOut, "the handshake took too long");
+    self->end(true, false);
+  });
+  armRead();
+}
+
+Value DBusConnection::entitlementValue(std::string_view key) {
+  return peer_ ? context_->services.entitlements.valueFor(*peer_, key) : Value();
+}
+
+std::string DBusConnection::description() const {
+  char text[96];
+  std::snprintf(text, sizeof text, "%llu of process %d, user %u", static_cast<unsigned long long>(number_),
+                process_, user_);
+  std::string line = text;
+  const std::string executable = stream_ ? stream_->peerExecutable() : std::string();
+  if (!executable.empty()) line.append(" (").append(executable).append(")");
+  return line;
+}
+
+void DBusConnection::setExportedObject(std::shared_ptr<ClientSessionInterface> object) {
+  exportedObject_ = std::move(object);
+}
+
+void DBusConnection::invalidate() {
+  if (invalidating_.exchange(true)) return;
+  queue_->async([self = shared_from_this()] { self->end(false, false); });
+}
+
+void DBusConnection::finish() {
+  if (finishing_.exchange(true)) return;
+  scheduleTurn();
+}
+
+void DBusConnection::abandon() {
+  invalidating_ = true;
+  Watch watch;
+  {
+    MutexLock lock(watchMutex_);
+    closed_ = true;
+    watch = std::move(watch_);
+  }
+  watch.cancel();
+  output_->close();
+}
+
+// Reports the one problem that ends the connection.
+DBusConnection::Step DBusConnection::breakOff(Reason reason, const char* problem) {
+  context_->services.counters.add(reason);
+  context_->services.log.normal("DBusConnection(end): connection %s: %s", description().c_str(), problem);
+  return Step::broken;
+}
+
+// The end. Runs on the queue; the second call does nothing.
+void DBusConnection::end(bool broken, bool waitForOutput) {
+  if (closed() || std::exchange(ended_, true)) return;
+  invalidating_ = true;
+  handshakeTimer_.cancel();
+  if (started_) {
+    Task interruption = std::move(interruptionHandler_), invalidation = std::move(invalidationHandler_);
+    if (broken && interruption) interruption();
+    if (invalidation) invalidation();
+  }
+  interruptionHandler_.reset();
+  invalidationHandler_.reset();
+  exportedObject_.reset();
+  handshake_.reset();
+  descriptors_.clear();
+  kept_ = std::string();
+  // What the turn's deferred work still answers leaves with the rest.
+  if (Turn* turn = Turn::current()) turn->runDeferred();
+  if (output_->finish() || !waitForOutput) closeStream();
+}
+
+void DBusConnection::closeStream() {
+  Watch watch;
+  {
+    MutexLock lock(watchMutex_);
+    if (std::exchange(closed_, true)) return;
+    watch = std::move(watch_);
+  }
+  watch.cancel();
+  output_->close();
+  stream_.reset();
+  context_->remove(number_, user_);
+}
+
+bool DBusConnection::closed() {
+  MutexLock lock(watchMutex_);
+  return closed_;
+}
+
+void DBusConnection::scheduleTurn() {
+  if (turnScheduled_.exchange(true)) return;
+  queue_->async([self = shared_from_this()] { self->turn(); });
+}
+
+void DBusConnection::armRead() {
+  armWatch(ready::readable);
+}
+
+// Asks the reactor for one report, of this and of what is asked for already.
+void DBusConnection::armWatch(unsigned events) {
+  MutexLock lock(watchMutex_);
+  if (closed_ || (armed_ & events) == events) return;
+  armed_ |= events;
+  if (watch_) {
+    if (watch_.modify(armed_ | ready::oneShot)) return;
+  } else {
+    watch_ = context_->services.reactor.watch(stream_->descriptor(), armed_ | ready::oneShot,
+                                              [weak = weak_from_this()](unsigned happened) {
+                                                if (const auto self = weak.lock())
+                                                  self->handleReady(happened);
+                                              });
+    if (watch_) return;
+  }
+  context_->services.log.error("DBusConnection(armWatch): the system refuses to watch connection %llu",
+                               static_cast<unsigned long long>(number_));
+  invalidating_ = true;
+  queue_->async([self = shared_from_this()] { self->end(true, false); });
+}
+
+// On the reactor's thread.
+void DBusConnection::handleReady(unsigned events) {
+  const bool gone = (events & (ready::ended | ready::failed)) != 0;
+  unsigned again = 0;
+  {
+    MutexLock lock(watchMutex_);
+    if (closed_) return;
+    if (!gone) again = armed_ & ~events;
+    armed_ = 0;
+  }
+  // A client that has ended its side is read to the end and then ended, even if it takes no more replies: the
+  // turn sees to all of it, and nothing is asked of the reactor here that it would report again at once.
+  if (gone) peerGone_ = true;
+  if ((events & ready::writable) != 0) output_->writable();
+  if (gone || (events & ready::readable) != 0) scheduleTurn();
+  if (again != 0) armWatch(again);
+}
+
+void DBusConnection::outputNeedsRoom() {
+  armWatch(ready::writable);
+}
+
+void DBusConnection::outputPaused() {
+  if (context_->services.counters.addAndMayLog(Reason::queuedBytesExceeded,
+                                               context_->services.clock.monotonic())) {
+    context_->services.log.normal(
+        "DBusConnection(outputPaused): connection %llu of user %u does not read its replies",
+        static_cast<unsigned long long>(number_), user_);
+  }
+}
+
+void DBusConnection::outputDrained() {
+  scheduleTurn();
+}
+
+void DBusConnection::outputOverflowed() {
+  if (context_->services.counters.addAndMayLog(Reason::clientNotReading,
+                                               context_->services.clock.monotonic())) {
+    context_->services.log.normal(
+        "DBusConnection(outputOverflowed): connection %llu of user %u ends, it reads nothing",
+        static_cast<unsigned long long>(number_), user_);
+  }
+  invalidate();
+}
+
+void DBusConnection::outputBroken() {
+  if (invalidating_.exchange(true)) {
+    scheduleTurn();  // a connection that waits to be written ends now
+    return;
+  }
+  queue_->async([self = shared_from_this()] { self->end(true, false); });
+}
+
+std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionary> sessionInfo,
+                                                         double timestamp, uint16_t category, uint16_t type,
+                                                         std::optional<Dictionary> payload) {
+  const auto sent = output_->send(
+      [&](MessageWriter& out, uint32_t serial) {
+        out.beginCall(serial, {.path = wire::kClientPath,
+                               .interface = wire::kReplyInterface,
+                               .member = "SendMessageToClient",
+                               .signature = "aa{sv}dqqaa{sv}",
+                               .expectsReply = false});
+        out.writeOptionalDictionary(sessionInfo);
+        out.writeDouble(timestamp);
+        out.writeUInt16(category);
+        out.writeUInt16(type);
+        out.writeOptionalDictionary(payload);
+        return out.end();
+      },
+      true);
+  switch (sent) {
+    case ConnectionOutput::Sent::yes:
+      return std::nullopt;
+    case ConnectionOutput::Sent::queueFull:
+      if (context_->services.counters.addAndMayLog(Reason::aggregatorMessageDropped,
+                                                   context_->services.clock.monotonic())) {
+        context_->services.log.normal(
+            "DBusConnection(sendMessageToClient): message dropped, connection %llu of user %u reads too slowly",
+            static_cast<unsigned long long>(number_), user_);
+      }
+      return Error{"KYTReportingErrorDomain", -1, "The client reads too slowly"};
+    case ConnectionOutput::Sent::refused:
+      return Error{"KYTReportingErrorDomain", -1, "The message is too large"};
+    case ConnectionOutput::Sent::closed:
+      break;
+  }
+  return Error{"KYTReportingErrorDomain", -1, "The connection was invalidated"};
+}
+
+}  // namespace kyt

@@ -1,0 +1,139 @@
+// One client's connection: the real Connection, over a Stream.
+//
+// It belongs to its serial queue (owner: the peer's user and one). The reactor reports once that there is
+// something to read; then a turn on the queue reads large blocks into a lent buffer, handles each call,
+// gathers the replies for one write and asks the reactor again. A turn ends after 256 calls or 1 MiB and
+// stands in line again. What follows the last whole message is kept until more comes; an idle connection
+// keeps nothing.
+//
+// The end has one road: the session's handlers run, what waits is written, the watch ends, the descriptor is
+// closed, the table forgets the connection.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "platform/Counters.h"
+#include "platform/Mutex.h"
+#include "platform/Reactor.h"
+#include "platform/SerialQueue.h"
+#include "platform/Timer.h"
+#include "platform/ipc/ConnectionOutput.h"
+#include "platform/ipc/Handshake.h"
+#include "platform/ipc/Listener.h"
+#include "platform/ipc/ServerContext.h"
+
+namespace kyt {
+
+class DBusConnection final : public Connection,
+                             private ClientSessionReplyInterface,
+                             private ConnectionOutput::Observer,
+                             public std::enable_shared_from_this<DBusConnection> {
+ public:
+  DBusConnection(std::shared_ptr<ServerContext> context, std::unique_ptr<Stream> stream, PeerCredentials peer,
+                 uint64_t number);
+  ~DBusConnection() override;
+
+  // Asks the delegate, on the queue; starts, or closes at once.
+  void offer(Listener& listener, ListenerDelegate& delegate);
+  // The server is going: no handler runs any more, nothing is written.
+  void abandon();
+
+  [[nodiscard]] Value entitlementValue(std::string_view key) override;
+  [[nodiscard]] std::string description() const override;
+  [[nodiscard]] uint32_t peerUser() const override { return user_; }
+  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
+  void setInterruptionHandler(Task handler) override { interruptionHandler_ = std::move(handler); }
+  void setInvalidationHandler(Task handler) override { invalidationHandler_ = std::move(handler); }
+  void resume() override { resumed_ = true; }
+  void invalidate() override;
+  void finish() override;
+  [[nodiscard]] ClientSessionReplyInterface& remoteObjectProxy() override { return *this; }
+  [[nodiscard]] const std::shared_ptr<SerialQueue>& queue() const override { return queue_; }
+
+ private:
+  // How a turn's piece of work ended.
+  enum class Step : uint8_t {
+    more,     // there is more to do at once
+    drained,  // the socket has no more: the reactor will say when it has
+    paused,   // the client does not read its replies
+    ended,    // the client ended the stream in good order
+    broken,   // the stream broke, or the client broke the protocol
+    stopped   // this side ends the connection
+  };
+  struct Progress {
+    unsigned calls = 0;
+    size_t bytes = 0;
+  };
+
+  void turn();
+  Step runSteps(Progress& progress);
+  Step step(std::span<std::byte> buffer, Progress& progress);
+  Step readMore(std::span<std::byte> buffer, size_t& bytes);
+  Step handleBytes(std::span<const std::byte> bytes, size_t& consumed, Progress& progress);
+  Step handleHandshake(std::span<const std::byte> bytes, size_t& consumed);
+  Step handleMessage(std::span<const std::byte> bytes, size_t& consumed);
+  Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken);
+  [[nodiscard]] bool mustPause() const;
+  void keepRest(std::span<const std::byte> rest);
+  Step breakOff(Reason reason, const char* problem);
+
+  void start();
+  void end(bool broken, bool waitForOutput);
+  void closeStream();
+  [[nodiscard]] bool closed();
+  void scheduleTurn();
+  void armRead();
+  void armWatch(unsigned events);
+  void handleReady(unsigned events);
+
+  void outputNeedsRoom() override;
+  void outputPaused() override;
+  void outputDrained() override;
+  void outputOverflowed() override;
+  void outputBroken() override;
+
+  [[nodiscard]] std::optional<Error> sendMessageToClient(std::optional<Dictionary> sessionInfo,
+                                                         double timestamp, uint16_t category, uint16_t type,
+                                                         std::optional<Dictionary> payload) override;
+
+  // Constant.
+  const std::shared_ptr<ServerContext> context_;
+  const uint64_t number_;
+  const uint32_t user_;
+  const int32_t process_;
+  const std::shared_ptr<SerialQueue> queue_;
+
+  // Synchronises itself.
+  std::shared_ptr<ConnectionOutput> output_;
+  std::atomic<bool> invalidating_{false};  // stop handling calls
+  std::atomic<bool> finishing_{false};     // stop reading
+  std::atomic<bool> peerGone_{false};      // the reactor saw the end of the client's side
+  std::atomic<bool> turnScheduled_{false};
+
+  // Of the queue.
+  std::unique_ptr<Stream> stream_;
+  std::unique_ptr<PeerCredentials> peer_;  // until resumed
+  std::unique_ptr<ServerHandshake> handshake_;
+  TimerHandle handshakeTimer_;
+  std::shared_ptr<ClientSessionInterface> exportedObject_;
+  Task interruptionHandler_, invalidationHandler_;
+  std::string kept_;   // the beginning of a message, or messages that the last turn left
+  size_t needed_ = 0;  // how much kept_ must hold before it is worth looking at
+  std::vector<Descriptor> descriptors_;
+  bool descriptorsAgreed_ = false;
+  bool resumed_ = false, started_ = false, ended_ = false;
+
+  // Guarded: the reactor's thread, the queue and writers arm the watch.
+  Mutex watchMutex_;
+  Watch watch_ GUARDED_BY(watchMutex_);
+  unsigned armed_ GUARDED_BY(watchMutex_) = 0;
+  bool closed_ GUARDED_BY(watchMutex_) = false;
+};
+
+}  // namespace kyt

@@ -1,0 +1,161 @@
+#include "platform/ipc/DBusServer.h"
+
+#include <atomic>
+#include <utility>
+
+#include "platform/Clock.h"
+#include "platform/Counters.h"
+#include "platform/Log.h"
+#include "platform/SerialQueue.h"
+#include "platform/ipc/DBusConnection.h"
+
+namespace kyt {
+namespace {
+
+constexpr unsigned kAcceptsPerTurn = 64;
+constexpr Duration kExhaustedPause = std::chrono::milliseconds(100);
+
+}  // namespace
+
+// The accepting half: lives on its own queue.
+class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
+ public:
+  Acceptance(std::shared_ptr<ServerContext> context, std::unique_ptr<StreamAcceptor> acceptor,
+             Listener& listener)
+      : context_(std::move(context)),
+        acceptor_(std::move(acceptor)),
+        listener_(listener),
+        queue_(SerialQueue::create("kyt.listener", context_->services.executor)) {}
+
+  void start(ListenerDelegate& delegate) {
+    delegate_ = &delegate;
+    MutexLock lock(mutex_);
+    if (stopped_) return;
+    watch_ = context_->services.reactor.watch(acceptor_->descriptor(), ready::readable | ready::oneShot,
+                                              [weak = weak_from_this()](unsigned) {
+                                                const auto self = weak.lock();
+                                                if (self) self->queue_->async([self] { self->acceptSome(); });
+                                              });
+    if (!watch_) context_->services.log.error("DBusServer(resume): the system refuses to watch the socket");
+  }
+
+  // Nothing is accepted any more when this returns, except by a turn that has begun.
+  void stop() {
+    Watch watch;
+    {
+      MutexLock lock(mutex_);
+      stopped_ = true;
+      watch = std::move(watch_);
+    }
+  }
+
+  // The queue's work is done and none comes: what it refers to may go. Not from the queue.
+  void wait() {
+    queue_->sync([] {});
+  }
+
+ private:
+  bool stopped() {
+    MutexLock lock(mutex_);
+    return stopped_;
+  }
+
+  void acceptSome() {
+    for (unsigned i = 0; i < kAcceptsPerTurn && !stopped(); ++i) {
+      std::unique_ptr<Stream> stream;
+      switch (acceptor_->accept(stream)) {
+        case AcceptStatus::accepted:
+          take(std::move(stream));
+          break;
+        case AcceptStatus::retry:
+          break;
+        case AcceptStatus::wouldBlock:
+          return rearm();
+        case AcceptStatus::exhausted:
+          return waitForDescriptors();
+        case AcceptStatus::failed:
+          context_->services.log.error("DBusServer(accept): the listening socket failed");
+          return;
+      }
+    }
+    rearm();
+  }
+
+  void rearm() {
+    MutexLock lock(mutex_);
+    if (watch_ && !watch_.rearm()) {
+      context_->services.log.error("DBusServer(accept): the system refuses to watch the socket");
+    }
+  }
+
+  // The waiting connection stays in the socket's backlog, so asking again at once would spin.
+  void waitForDescriptors() {
+    if (context_->services.counters.addAndMayLog(Reason::tooManyConnections,
+                                                 context_->services.clock.monotonic())) {
+      context_->services.log.error("DBusServer(accept): no descriptors left for new connections");
+    }
+    pause_ = context_->services.timers.after(kExhaustedPause, queue_, [weak = weak_from_this()] {
+      if (const auto self = weak.lock()) self->acceptSome();
+    });
+  }
+
+  void take(std::unique_ptr<Stream> stream) {
+    PeerCredentials peer = stream->peer();
+    const uint32_t user = peer.uid;
+    switch (context_->admit(user)) {
+      case ServerContext::Admission::admitted:
+        break;
+      case ServerContext::Admission::tooMany:
+        return refuse(Reason::tooManyConnections, user);
+      case ServerContext::Admission::tooManyOfUser:
+        return refuse(Reason::tooManyConnectionsOfUser, user);
+    }
+    const uint64_t number = ++lastNumber_;
+    const auto connection =
+        std::make_shared<DBusConnection>(context_, std::move(stream), std::move(peer), number);
+    context_->enlist(number, connection);
+    connection->offer(listener_, *delegate_);
+  }
+
+  void refuse(Reason reason, uint32_t user) {
+    if (context_->services.counters.addAndMayLog(reason, context_->services.clock.monotonic())) {
+      context_->services.log.normal("DBusServer(accept): connection of user %u refused: %s", user,
+                                    reasonName(reason));
+    }
+  }
+
+  const std::shared_ptr<ServerContext> context_;
+  const std::unique_ptr<StreamAcceptor> acceptor_;
+  Listener& listener_;
+  const std::shared_ptr<SerialQueue> queue_;
+  ListenerDelegate* delegate_ = nullptr;
+  uint64_t lastNumber_ = 0;  // of the queue, as the pause
+  TimerHandle pause_;
+  Mutex mutex_;
+  Watch watch_ GUARDED_BY(mutex_);
+  bool stopped_ GUARDED_BY(mutex_) = false;
+};
+
+DBusServer::DBusServer(DBusServerServices services, std::unique_ptr<StreamAcceptor> acceptor)
+    : context_(std::make_shared<ServerContext>(std::move(services))),
+      acceptance_(std::make_shared<Acceptance>(context_, std::move(acceptor), *this)) {}
+
+DBusServer::~DBusServer() {
+  stopAccepting();
+  for (const auto& connection : context_->connections()) connection->abandon();
+}
+
+void DBusServer::resume() {
+  if (delegate_ != nullptr) acceptance_->start(*delegate_);
+}
+
+void DBusServer::stopAccepting() {
+  acceptance_->stop();
+  acceptance_->wait();
+}
+
+void DBusServer::invalidateConnections() {
+  for (const auto& connection : context_->connections()) connection->invalidate();
+}
+
+}  // namespace kyt

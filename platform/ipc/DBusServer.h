@@ -1,0 +1,41 @@
+// The daemon's side of the IPC service: the real Listener. Accepts on its own serial queue whenever the
+// reactor says so, refuses what passes the limits of connections, and offers the rest to the delegate, each
+// on its own queue. When the system has no descriptors left it waits a little before it accepts again;
+// connections that exist go on.
+//
+// Owned by the composition root. The delegate and all services outlive it; it outlives nothing: its
+// connections share what they need, and are abandoned at its destruction when they have not ended before.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+
+#include "platform/Mutex.h"
+#include "platform/Reactor.h"
+#include "platform/Timer.h"
+#include "platform/ipc/Listener.h"
+#include "platform/ipc/ServerContext.h"
+#include "platform/ipc/Stream.h"
+
+namespace kyt {
+
+class DBusServer final : public Listener {
+ public:
+  DBusServer(DBusServerServices services, std::unique_ptr<StreamAcceptor> acceptor);
+  ~DBusServer() override;
+  void setDelegate(ListenerDelegate& delegate) override { delegate_ = &delegate; }
+  void resume() override;
+  void stopAccepting() override;
+  // How many connections exist, those that are ending included. Any thread.
+  [[nodiscard]] size_t connectionCount() const { return context_->connectionCount(); }
+  // The deadline of a shut-down: invalidates every connection that is left.
+  void invalidateConnections();
+
+ private:
+  class Acceptance;
+  const std::shared_ptr<ServerContext> context_;
+  std::shared_ptr<Acceptance> acceptance_;
+  ListenerDelegate* delegate_ = nullptr;
+};
+
+}  // namespace kyt

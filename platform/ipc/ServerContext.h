@@ -1,0 +1,75 @@
+// What the connections of one server share: the services they use, the table of connections with its limits,
+// and the read buffers that are lent for a turn. Lives as long as the last of them. Any thread.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "platform/Mutex.h"
+#include "platform/ipc/ClientSessionDispatcher.h"
+
+namespace kyt {
+
+class Clock;
+class DBusConnection;
+class Entitlements;
+class Executor;
+class Log;
+class Reactor;
+class TimerService;
+struct Limits;
+
+// Everything outlives the server and its connections.
+struct DBusServerServices {
+  const Limits& limits;
+  Counters& counters;
+  Log& log;
+  Clock& clock;
+  TimerService& timers;
+  Executor& executor;
+  Reactor& reactor;
+  Entitlements& entitlements;
+  std::string machineId;  // 32 hexadecimal digits; also the server's GUID in the handshake
+};
+
+// Buffers for large reads, lent to a turn: an idle connection holds none. A few stay for the next turns.
+class ReadBuffers {
+ public:
+  static constexpr size_t kBytes = 65536;
+  using Buffer = std::unique_ptr<std::byte[]>;
+  [[nodiscard]] Buffer take();
+  void give(Buffer buffer);
+
+ private:
+  static constexpr size_t kMostKept = 4;
+  Mutex mutex_;
+  std::vector<Buffer> kept_ GUARDED_BY(mutex_);
+};
+
+class ServerContext {
+ public:
+  explicit ServerContext(DBusServerServices services);
+
+  enum class Admission : uint8_t { admitted, tooMany, tooManyOfUser };
+  // Counts a connection of that user, or says which limit it would pass.
+  [[nodiscard]] Admission admit(uint32_t user);
+  void enlist(uint64_t number, std::shared_ptr<DBusConnection> connection);
+  void remove(uint64_t number, uint32_t user);
+  [[nodiscard]] size_t connectionCount() const;
+  [[nodiscard]] std::vector<std::shared_ptr<DBusConnection>> connections() const;
+
+  const DBusServerServices services;
+  const ClientSessionDispatcher dispatcher;
+  ReadBuffers buffers;
+
+ private:
+  mutable Mutex mutex_;
+  size_t count_ GUARDED_BY(mutex_) = 0;
+  std::unordered_map<uint32_t, size_t> countOfUser_ GUARDED_BY(mutex_);
+  std::unordered_map<uint64_t, std::shared_ptr<DBusConnection>> connections_ GUARDED_BY(mutex_);
+};
+
+}  // namespace kyt

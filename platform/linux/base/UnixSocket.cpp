@@ -1,0 +1,225 @@
+#include "platform/linux/base/UnixSocket.h"
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <cstdlib>
+#include <cstring>
+#include <utility>
+
+#include "platform/Limits.h"
+#include "platform/linux/base/Descriptors.h"
+
+#ifndef SO_PEERPIDFD
+#define SO_PEERPIDFD 77
+#endif
+
+namespace kyt {
+namespace {
+
+constexpr int kFirstActivatedDescriptor = 3;
+
+Error systemError(const std::string& what) {
+  const int code = errno;
+  return Error{"POSIX", code, what + ": " + std::strerror(code)};
+}
+
+// An option whose size is known only afterwards.
+std::vector<char> variableOption(int socket, int option) {
+  std::vector<char> value(256);
+  for (int attempt = 0; attempt < 4; ++attempt) {
+    auto size = static_cast<socklen_t>(value.size());
+    if (::getsockopt(socket, SOL_SOCKET, option, value.data(), &size) == 0) {
+      value.resize(size);
+      return value;
+    }
+    if (errno != ERANGE) break;
+    value.resize(size > value.size() ? size : value.size() * 2);
+  }
+  return {};
+}
+
+bool fillAddress(const std::string& path, sockaddr_un& address) {
+  address = {};
+  address.sun_family = AF_UNIX;
+  if (path.empty() || path.size() >= sizeof address.sun_path) return false;
+  std::memcpy(address.sun_path, path.data(), path.size());
+  return true;
+}
+
+// Whether somebody listens there. Anything but "refused" and "no such file" counts as somebody.
+bool isLive(const sockaddr_un& address) {
+  const Descriptor probe = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (probe.get() < 0) return true;
+  if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return true;
+  return errno != ECONNREFUSED && errno != ENOENT;
+}
+
+}  // namespace
+
+StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) {
+  iovec piece{buffer.data(), buffer.size()};
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * Limits::maxDescriptorsPerMessage)> control;
+  msghdr message{};
+  message.msg_iov = &piece;
+  message.msg_iovlen = 1;
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  ssize_t count = 0;
+  do {
+    count = ::recvmsg(socket_.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  } while (count < 0 && errno == EINTR);
+  if (count < 0) return {errno == EAGAIN ? StreamStatus::wouldBlock : StreamStatus::failed, 0};
+  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr; header = CMSG_NXTHDR(&message, header)) {
+    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
+    const size_t bytes = header->cmsg_len - CMSG_LEN(0);
+    for (size_t at = 0; at + sizeof(int) <= bytes; at += sizeof(int)) {
+      int received = -1;
+      std::memcpy(&received, CMSG_DATA(header) + at, sizeof received);
+      descriptors.push_back(ownDescriptor(received));
+    }
+  }
+  if ((message.msg_flags & MSG_CTRUNC) != 0) return {StreamStatus::truncated, 0};
+  if (count == 0) return {StreamStatus::ended, 0};
+  return {StreamStatus::ok, static_cast<size_t>(count)};
+}
+
+StreamResult UnixStream::write(std::string_view bytes) {
+  ssize_t count = 0;
+  do {
+    count = ::send(socket_.get(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+  } while (count < 0 && errno == EINTR);
+  if (count < 0) return {errno == EAGAIN ? StreamStatus::wouldBlock : StreamStatus::failed, 0};
+  return {StreamStatus::ok, static_cast<size_t>(count)};
+}
+
+PeerCredentials UnixStream::peer() {
+  PeerCredentials peer;
+  ucred credentials{};
+  socklen_t size = sizeof credentials;
+  if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0) {
+    peer.uid = peer.gid = ~0u;  // nobody: no grant matches
+    return peer;
+  }
+  peer.pid = credentials.pid;
+  peer.uid = credentials.uid;
+  peer.gid = credentials.gid;
+  const std::vector<char> groups = variableOption(socket_.get(), SO_PEERGROUPS);
+  peer.groups.resize(groups.size() / sizeof(gid_t));
+  if (!groups.empty()) std::memcpy(peer.groups.data(), groups.data(), peer.groups.size() * sizeof(gid_t));
+  const std::vector<char> label = variableOption(socket_.get(), SO_PEERSEC);
+  peer.securityLabel.assign(label.data(), ::strnlen(label.data(), label.size()));
+  int pidfd = -1;
+  size = sizeof pidfd;
+  if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) == 0)
+    peer.pidfd = ownDescriptor(pidfd);
+  return peer;
+}
+
+std::string UnixStream::peerExecutable() const {
+  ucred credentials{};
+  socklen_t size = sizeof credentials;
+  if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0) return {};
+  char target[256];
+  const std::string link = "/proc/" + std::to_string(credentials.pid) + "/exe";
+  const ssize_t length = ::readlink(link.c_str(), target, sizeof target);
+  return length > 0 ? std::string(target, static_cast<size_t>(length)) : std::string();
+}
+
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bindAt(const std::string& path) {
+  sockaddr_un address;
+  if (!fillAddress(path, address)) {
+    return Error{"POSIX", ENAMETOOLONG, "The socket path \"" + path + "\" is empty or longer than 107 bytes"};
+  }
+  Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (socket.get() < 0) return systemError("Cannot make a socket");
+  struct stat status {};
+  if (::lstat(path.c_str(), &status) == 0) {
+    if (!S_ISSOCK(status.st_mode)) return Error{"POSIX", EEXIST, "\"" + path + "\" exists and is no socket"};
+    if (isLive(address)) return Error{"POSIX", EADDRINUSE, "Another process listens at \"" + path + "\""};
+    if (::unlink(path.c_str()) != 0) return systemError("Cannot remove the stale socket \"" + path + "\"");
+  }
+  if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+    return systemError("Cannot bind to \"" + path + "\"");
+  }
+  if (::lstat(path.c_str(), &status) != 0 || ::chmod(path.c_str(), 0666) != 0) {
+    return systemError("Cannot open \"" + path + "\" to clients");
+  }
+  if (::listen(socket.get(), SOMAXCONN) != 0) return systemError("Cannot listen at \"" + path + "\"");
+  return std::unique_ptr<UnixSocketAcceptor>(
+      new UnixSocketAcceptor(std::move(socket), path, status.st_dev, status.st_ino));
+}
+
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::adoptActivated() {
+  const char* const pid = std::getenv("LISTEN_PID");
+  const char* const count = std::getenv("LISTEN_FDS");
+  if (pid == nullptr || count == nullptr || std::to_string(::getpid()) != pid) {
+    return std::unique_ptr<UnixSocketAcceptor>();
+  }
+  const std::string given = count;
+  ::unsetenv("LISTEN_PID");
+  ::unsetenv("LISTEN_FDS");
+  ::unsetenv("LISTEN_FDNAMES");
+  if (given != "1")
+    return Error{"POSIX", EINVAL, "The service manager passed " + given + " sockets instead of one"};
+  return adopt(ownDescriptor(kFirstActivatedDescriptor));
+}
+
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::adopt(Descriptor socket) {
+  int domain = 0, type = 0, listening = 0;
+  socklen_t size = sizeof domain;
+  const auto option = [&](int name, int& value) {
+    size = sizeof value;
+    return ::getsockopt(socket.get(), SOL_SOCKET, name, &value, &size) == 0;
+  };
+  if (!option(SO_DOMAIN, domain) || !option(SO_TYPE, type) || !option(SO_ACCEPTCONN, listening) ||
+      domain != AF_UNIX || type != SOCK_STREAM || listening != 1) {
+    return Error{"POSIX", EINVAL, "The descriptor that was passed is no listening Unix stream socket"};
+  }
+  const int flags = ::fcntl(socket.get(), F_GETFL);
+  if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) != 0 ||
+      ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC) != 0) {
+    return systemError("Cannot set up the socket that was passed");
+  }
+  return std::unique_ptr<UnixSocketAcceptor>(new UnixSocketAcceptor(std::move(socket), std::string(), 0, 0));
+}
+
+UnixSocketAcceptor::~UnixSocketAcceptor() {
+  if (path_.empty()) return;
+  struct stat status {};
+  if (::lstat(path_.c_str(), &status) == 0 && status.st_dev == device_ && status.st_ino == inode_) {
+    ::unlink(path_.c_str());
+  }
+}
+
+AcceptStatus UnixSocketAcceptor::accept(std::unique_ptr<Stream>& stream) {
+  Descriptor socket = ownDescriptor(::accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
+  if (socket.get() >= 0) {
+    stream = std::make_unique<UnixStream>(std::move(socket));
+    return AcceptStatus::accepted;
+  }
+  switch (errno) {
+    case EAGAIN:
+      return AcceptStatus::wouldBlock;
+    case EINTR:
+    case ECONNABORTED:
+    case EPROTO:
+    case EPERM:
+      return AcceptStatus::retry;
+    case EMFILE:
+    case ENFILE:
+    case ENOBUFS:
+    case ENOMEM:
+      return AcceptStatus::exhausted;
+    default:
+      return AcceptStatus::failed;
+  }
+}
+
+}  // namespace kyt

@@ -1,0 +1,54 @@
+// Unix stream sockets for the IPC server: a connection's stream, and the listening socket, which is either
+// made at a path (taking the place of a stale socket, never of a live one) or handed over by the service
+// manager.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <variant>
+
+#include "platform/Error.h"
+#include "platform/ipc/Stream.h"
+
+namespace kyt {
+
+class UnixStream final : public Stream {
+ public:
+  explicit UnixStream(Descriptor socket) : socket_(std::move(socket)) {}
+  [[nodiscard]] StreamResult read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) override;
+  [[nodiscard]] StreamResult write(std::string_view bytes) override;
+  [[nodiscard]] PeerCredentials peer() override;
+  [[nodiscard]] std::string peerExecutable() const override;
+  [[nodiscard]] int descriptor() const override { return socket_.get(); }
+
+ private:
+  const Descriptor socket_;
+};
+
+class UnixSocketAcceptor final : public StreamAcceptor {
+ public:
+  // Binds and listens at `path` with mode 0666 (who may connect is the entitlements' matter). The error's
+  // description is one line for the log.
+  [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> bindAt(
+      const std::string& path);
+  // Takes over the one listening socket that the service manager passed (LISTEN_PID, LISTEN_FDS; both are
+  // removed from the environment); null when it passed none. Only before other threads exist.
+  [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> adoptActivated();
+  // Takes over a descriptor that must be a listening Unix stream socket.
+  [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> adopt(Descriptor socket);
+  // Removes the socket that bindAt() made, unless another has taken its place.
+  ~UnixSocketAcceptor() override;
+
+  [[nodiscard]] AcceptStatus accept(std::unique_ptr<Stream>& stream) override;
+  [[nodiscard]] int descriptor() const override { return socket_.get(); }
+  [[nodiscard]] bool activated() const { return path_.empty(); }
+
+ private:
+  UnixSocketAcceptor(Descriptor socket, std::string path, uint64_t device, uint64_t inode)
+      : socket_(std::move(socket)), path_(std::move(path)), device_(device), inode_(inode) {}
+  const Descriptor socket_;
+  const std::string path_;  // of the socket that this object made
+  const uint64_t device_, inode_;
+};
+
+}  // namespace kyt
