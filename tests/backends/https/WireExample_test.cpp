@@ -70,8 +70,8 @@ TEST_F(WireExample, ItsDigestIsRight) {
   const std::string body = block("json message");
   unsigned char digest[EVP_MAX_MD_SIZE];
   unsigned length = 0;
-  HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(body.data()),
-       body.size(), digest, &length);
+  HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()),
+       reinterpret_cast<const unsigned char*>(body.data()), body.size(), digest, &length);
   std::string expected("X-KYT-DIGEST: <");
   for (unsigned i = 0; i < length; ++i) {
     char digits[4];
