@@ -24,6 +24,7 @@ struct Limits {
   static constexpr int maxObjectDepth = 32;                    // property lists and JSON: recursion
   static constexpr int maxIPCDepth = 64;                       // the wire protocol's own: 32 arrays + 32 structs, and variants
   static constexpr size_t maxHTTPReplyBytes = 4u << 20;        // a server cannot fill the memory
+  static constexpr size_t maxPropertyListTags = 131072;         // each takes up to 128 bytes while it is read
   static constexpr size_t maxWaitingBytes = 16u << 20;         // request bodies waiting for connectivity, each URL session
   static constexpr size_t maxWorkers = 512;                    // threads
   static constexpr size_t maxHandshakeBytes = 16384;           // before authentication

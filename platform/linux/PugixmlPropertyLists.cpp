@@ -1,5 +1,6 @@
 #include "platform/linux/PugixmlPropertyLists.h"
 
+#include <algorithm>
 #include <charconv>
 #include <chrono>
 #include <optional>
@@ -211,6 +212,8 @@ Error failure(int code, std::string what) {
 
 std::variant<Value, Error> PugixmlPropertyLists::parse(std::string_view bytes) {
   if (bytes.size() > Limits::maxHTTPReplyBytes) return failure(-1, "The property list is too long");
+  if (static_cast<size_t>(std::count(bytes.begin(), bytes.end(), '<')) > Limits::maxPropertyListTags)
+    return failure(-1, "The property list has too many tags");
   // The parser takes a NUL for the end of the text.
   if (const size_t zero = bytes.find('\0'); zero != bytes.npos)
     return failure(-1, "A NUL character (offset " + std::to_string(zero) + ")");

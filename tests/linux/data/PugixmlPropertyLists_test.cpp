@@ -142,10 +142,11 @@ TEST(PropertyLists, RefuseTextThatIsNotUTF8) {
   EXPECT_EQ(errorIn("<dict><key>\xC3</key><true/></dict>"), "The text is not valid UTF-8 (offset 14)");
 }
 
-TEST(PropertyLists, LimitDepthAndSize) {
+TEST(PropertyLists, LimitDepthTagsAndSize) {
   EXPECT_EQ(parsed(nested(32)).kind(), Value::Kind::array);
   EXPECT_EQ(errorIn(nested(33)), "Containers are nested too deep (offset 232)");
-  EXPECT_NE(errorIn(nested(200000)), "no error");
+  EXPECT_EQ(errorIn(nested(65000)), "Containers are nested too deep (offset 232)");
+  EXPECT_EQ(errorIn(nested(65536)), "The property list has too many tags");
   EXPECT_EQ(errorOf(std::string(Limits::maxHTTPReplyBytes + 1, ' ')), "The property list is too long");
 }
 
