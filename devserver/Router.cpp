@@ -184,7 +184,7 @@ Answer Router::answerStorebag(const Request& request) {
   Reply reply = text(404, "no such storebag");
   if (bag) {
     const bool unchanged = !bag->lastModified.empty() && fetch.ifModifiedSince == bag->lastModified;
-    reply = {unchanged ? 304U : 200U, unchanged ? std::string() : *bag->content, "application/xml", {}};
+    reply = {unchanged ? 304U : 200U, *bag->content, "application/xml", {}};
     if (!bag->lastModified.empty()) reply.headers.push_back({"Last-Modified", bag->lastModified});
     reply.headers.push_back({"Cache-Control", bag->cacheControl});
     fetch.lastModified = bag->lastModified;

@@ -172,7 +172,7 @@ void Store::write(Pending& pending) {
   for (Post& post : pending.posts) writePost(post);
   for (Fetch& fetch : pending.fetches) writeFetch(fetch);
   applyRetention();
-  writer_->execute("COMMIT");
+  if (!writer_->execute("COMMIT")) writer_->execute("ROLLBACK");
 }
 
 void Store::writePost(Post& post) {

@@ -42,6 +42,7 @@ TEST_F(StorebagsTest, ThatDidNotChangeAreAnswered304WithLastModifiedAndNoBody) {
   EXPECT_EQ(again.status, 304);
   EXPECT_EQ(again.body, "");
   EXPECT_EQ(again.header("last-modified"), lastModified);
+  EXPECT_EQ(again.header("content-length"), "18");  // of what a 200 would carry
   EXPECT_EQ(again.header("cache-control"), "max-age=120");
   EXPECT_EQ(fetch("/bags/tolvar/cadmor", "Thu, 01 Jan 1970 00:00:00 GMT").status, 200);
 }
