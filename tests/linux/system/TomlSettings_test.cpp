@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <cctype>
+
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -133,6 +135,38 @@ TEST(TomlSettings, BrokenTextIsAnErrorWithItsLineInOnePlainLine) {
   const std::string control = errorOf("[storebag]\n\x1b[2J = 1\n");
   EXPECT_EQ(control.find('\x1b'), std::string::npos) << control;
   EXPECT_EQ(control.find('\n'), std::string::npos) << control;
+}
+
+TEST(TomlSettings, StrayCharactersOfAnyScriptAreErrors) {
+  // The whole area that the parser's test for blanks knows, and beyond.
+  for (uint32_t c = 0xA1; c < 0x10000; ++c) {
+    if (c >= 0xD800 && c < 0xE000) continue;
+    std::string text = "[log]\ntarget";
+    if (c < 0x800) {
+      text += static_cast<char>(0xC0 | c >> 6);
+    } else {
+      text += static_cast<char>(0xE0 | c >> 12);
+      text += static_cast<char>(0x80 | (c >> 6 & 0x3F));
+    }
+    text += static_cast<char>(0x80 | (c & 0x3F));
+    ASSERT_EQ(errorOf(text + " = 1\n").find("k.toml:"), 0u) << std::hex << c;
+  }
+}
+
+TEST(TomlSettings, ASectionsNameMustBeAKey) {
+  for (char c = 1; c > 0; ++c) {
+    const std::string name(1, c);
+    const bool isKey = std::isalnum(static_cast<unsigned char>(c)) != 0 || c == '_' || c == '-';
+    if (!isKey) {
+      EXPECT_EQ(errorOf("[" + name + "]\n").find("k.toml:"), 0u) << static_cast<int>(c);
+    }
+  }
+  EXPECT_EQ(errorOf("[`a]\n").find("k.toml:1: "), 0u);
+}
+
+TEST(TomlSettings, ControlCharactersAreErrors) {
+  EXPECT_EQ(errorOf(std::string("[log]\n\0", 7)), "k.toml:2: a control character");
+  EXPECT_EQ(errorOf("[log]\n# \x7f\n"), "k.toml:2: a control character");
 }
 
 TEST(TomlSettings, DeepNestingIsAnErrorAndNoOverflow) {
