@@ -1,4 +1,5 @@
-// Who runs queues. The real one is the elastic worker pool; tests use ManualExecutor (platform/fake/).
+// Who runs queues. The real one is the elastic worker pool; tests use ManualExecutor (platform/fake/). It
+// outlives its queues and every thread that submits.
 #pragma once
 
 #include <cstdint>
@@ -15,6 +16,10 @@ class Executor {
   // runs it before returning. Holds the queue until it has run. After its shut-down it calls
   // queue->discardPending() instead.
   virtual void submit(std::shared_ptr<SerialQueue> queue) = 0;
+  // Whether a thread of somebody else may run a queue of this executor now, in place of submit(). If so it
+  // calls giveBack() afterwards; a shut-down waits for that.
+  [[nodiscard]] virtual bool borrow() { return false; }
+  virtual void giveBack() {}
 };
 
 }  // namespace kyt

@@ -294,6 +294,7 @@ void Turn::defer(std::shared_ptr<SerialQueue> queue) {
 }
 
 std::shared_ptr<SerialQueue> Turn::takeFirst() {
+  if (!outermost_) return currentTurn->takeFirst();
   if (first_ == end_) return nullptr;
   std::shared_ptr<SerialQueue> queue =
       std::move(first_ < near_.size() ? near_[first_] : far_[first_ - near_.size()]);
@@ -318,7 +319,7 @@ void Turn::handDeferredToExecutors() {
   if (!outermost_) return currentTurn->handDeferredToExecutors();
   if (beforeBlocking_) beforeBlocking_();
   while (std::shared_ptr<SerialQueue> queue = takeFirst()) {
-    Executor& executor = queue->executor_;
+    Executor& executor = queue->executor();
     executor.submit(std::move(queue));
   }
 }

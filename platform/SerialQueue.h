@@ -57,6 +57,7 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
 
   [[nodiscard]] const char* label() const noexcept { return label_; }
   [[nodiscard]] uint64_t owner() const noexcept { return owner_; }
+  [[nodiscard]] Executor& executor() const noexcept { return executor_; }
 
   // For executors. Runs what is pending when it begins, at most `kFairShare` pieces; what is left or came
   // meanwhile is submitted again, so that queues take turns. Returns at once when another thread is running
@@ -112,16 +113,17 @@ class Turn {
   Turn& operator=(const Turn&) = delete;
   void runDeferred();
   static Turn* current() noexcept;  // the outermost one of this thread; null outside
+  // The first deferred queue, for who runs or submits it otherwise; null when there is none.
+  [[nodiscard]] std::shared_ptr<SerialQueue> takeFirst();
   // Also calls what setBeforeBlocking() was given, so that nobody waits for what this turn holds back.
   void handDeferredToExecutors();
-  // Called on this thread whenever the outermost turn is about to block, until it is set again (empty: nothing).
-  // A connection sends the replies that it gathers for one write.
+  // Called on this thread whenever the outermost turn is about to block, until it is set again (empty:
+  // nothing). A connection sends the replies that it gathers for one write.
   void setBeforeBlocking(Task task);
 
  private:
   friend class SerialQueue;
   void defer(std::shared_ptr<SerialQueue> queue);
-  std::shared_ptr<SerialQueue> takeFirst();
 
   bool outermost_;
   size_t first_ = 0, end_ = 0;  // what is left to run of near_ with far_ behind it

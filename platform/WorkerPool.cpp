@@ -20,7 +20,7 @@
 
 namespace kyt {
 
-struct WorkerPool::Worker {
+struct WorkerPool::Worker final : BlockingObserver {
   static thread_local Worker* current;
   Implementation* pool = nullptr;
   unsigned number = 0;
@@ -32,7 +32,9 @@ struct WorkerPool::Worker {
   uint64_t owner = 0;  // of the queue it runs
   // Its own thread's.
   const SerialQueue* queue = nullptr;  // what it runs
-  unsigned blockingDepth = 0;
+
+  void willBlock() override;
+  void hasBlocked() override;
 };
 
 thread_local WorkerPool::Worker* WorkerPool::Worker::current = nullptr;
@@ -49,6 +51,8 @@ class WorkerPool::Implementation {
   void shutDown();
   void block();
   void unblock();
+  [[nodiscard]] bool borrow();
+  void giveBack();
   [[nodiscard]] WorkerPoolFigures figures();
 
  private:
@@ -80,6 +84,7 @@ class WorkerPool::Implementation {
   size_t blocked_ GUARDED_BY(mutex_) = 0;
   size_t mostWorkers_ GUARDED_BY(mutex_) = 0;
   uint64_t wakeUps_ GUARDED_BY(mutex_) = 0;
+  size_t borrowed_ GUARDED_BY(mutex_) = 0;  // queues that threads of others run
   bool stopping_ GUARDED_BY(mutex_) = false;
 };
 
@@ -142,6 +147,7 @@ void WorkerPool::Implementation::start() {
 
 void WorkerPool::Implementation::work(Worker& self) {
   Worker::current = &self;
+  BlockingObserver::exchange(&self);
   if (options_.nameThread != nullptr) {
     char name[16];
     std::snprintf(name, sizeof name, "%.11s-%u", options_.name, self.number % 1000);
@@ -244,6 +250,18 @@ void WorkerPool::Implementation::unblock() {
   ++running_;
 }
 
+bool WorkerPool::Implementation::borrow() {
+  MutexLock lock(mutex_);
+  if (stopping_) return false;
+  ++borrowed_;
+  return true;
+}
+
+void WorkerPool::Implementation::giveBack() {
+  MutexLock lock(mutex_);
+  if (--borrowed_ == 0 && stopping_) allEnded_.notifyAll();
+}
+
 void WorkerPool::Implementation::shutDown() {
   std::vector<Worker*> sleepers;
   {
@@ -259,7 +277,7 @@ void WorkerPool::Implementation::shutDown() {
   Queues pending;
   {
     MutexLock lock(mutex_);
-    while (workers_ > 0) allEnded_.wait(mutex_);
+    while (workers_ > 0 || borrowed_ > 0) allEnded_.wait(mutex_);
     last = std::move(ended_);
     pending.swap(ready_);
     for (auto& [owner, queues] : parked_)
@@ -292,6 +310,12 @@ WorkerPool::~WorkerPool() {
 void WorkerPool::submit(std::shared_ptr<SerialQueue> queue) {
   implementation_->submit(std::move(queue));
 }
+bool WorkerPool::borrow() {
+  return implementation_->borrow();
+}
+void WorkerPool::giveBack() {
+  implementation_->giveBack();
+}
 void WorkerPool::shutDown() {
   implementation_->shutDown();
 }
@@ -299,13 +323,30 @@ WorkerPoolFigures WorkerPool::figures() const {
   return implementation_->figures();
 }
 
-BlockingScope::BlockingScope() : worker_(WorkerPool::Worker::current) {
+void WorkerPool::Worker::willBlock() {
+  pool->block();
+}
+void WorkerPool::Worker::hasBlocked() {
+  pool->unblock();
+}
+
+namespace {
+
+thread_local BlockingObserver* blockingObserver = nullptr;
+
+}  // namespace
+
+BlockingObserver* BlockingObserver::exchange(BlockingObserver* observer) noexcept {
+  return std::exchange(blockingObserver, observer);
+}
+
+BlockingScope::BlockingScope() : observer_(blockingObserver) {
   if (Turn* turn = Turn::current()) turn->handDeferredToExecutors();
-  if (worker_ != nullptr && worker_->blockingDepth++ == 0) worker_->pool->block();
+  if (observer_ != nullptr && observer_->depth_++ == 0) observer_->willBlock();
 }
 
 BlockingScope::~BlockingScope() {
-  if (worker_ != nullptr && --worker_->blockingDepth == 0) worker_->pool->unblock();
+  if (observer_ != nullptr && --observer_->depth_ == 0) observer_->hasBlocked();
 }
 
 void Monitor::lock() {

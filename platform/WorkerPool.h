@@ -41,20 +41,36 @@ class WorkerPool final : public Executor {
   explicit WorkerPool(WorkerPoolOptions options);
   ~WorkerPool() override;  // shutDown()
   void submit(std::shared_ptr<SerialQueue> queue) override;
+  [[nodiscard]] bool borrow() override;
+  void giveBack() override;
   // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a
   // worker.
   void shutDown();
   [[nodiscard]] WorkerPoolFigures figures() const;
 
  private:
-  friend class BlockingScope;
   struct Worker;
   class Implementation;
   std::unique_ptr<Implementation> implementation_;
 };
 
-// Announces that this thread is about to wait for something that takes long. No effect on threads that are no
-// workers. Before it waits, whatever this thread's turn deferred is handed to the executors.
+// Who is told when its thread is about to wait: a worker, so that its pool keeps others running, and the
+// reactor, so that another thread goes on waiting for events. Nested waits are told once.
+class BlockingObserver {
+ public:
+  virtual ~BlockingObserver() = default;
+  virtual void willBlock() = 0;
+  virtual void hasBlocked() = 0;
+  // Of the calling thread; null: none. Returns the former one.
+  static BlockingObserver* exchange(BlockingObserver* observer) noexcept;
+
+ private:
+  friend class BlockingScope;
+  unsigned depth_ = 0;
+};
+
+// Announces that this thread is about to wait for something that takes long. No effect on threads without an
+// observer. Before it waits, whatever this thread's turn deferred is handed to the executors.
 class BlockingScope {
  public:
   BlockingScope();
@@ -63,7 +79,7 @@ class BlockingScope {
   BlockingScope& operator=(const BlockingScope&) = delete;
 
  private:
-  WorkerPool::Worker* worker_;
+  BlockingObserver* observer_;
 };
 
 }  // namespace kyt

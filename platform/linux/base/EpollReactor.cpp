@@ -1,3 +1,6 @@
+// What handlers and timers give to queues is gathered while one batch of events is handled. At a quiet rate
+// the first few of these queues are then run right here; the others go to their executors.
+//
 // One mutex guards registrations and timers; it is never held while a handler runs or a queue is given work.
 // An event carries the number of its slot and the slot's generation, so that one harvested before its watch
 // was destroyed finds nothing.
@@ -13,7 +16,6 @@
 #include <atomic>
 #include <map>
 #include <set>
-#include <system_error>
 #include <thread>
 #include <utility>
 #include <vector>
@@ -21,8 +23,9 @@
 #include "platform/ConditionVariable.h"
 #include "platform/Mutex.h"
 #include "platform/SerialQueue.h"
+#include "platform/WorkerPool.h"
 #include "platform/linux/base/Descriptors.h"
-#include "platform/linux/base/Threads.h"
+#include "platform/linux/base/LeaderThreads.h"
 
 namespace kyt {
 
@@ -30,6 +33,8 @@ namespace {
 
 constexpr uint64_t kStopEvent = ~uint64_t{0};
 constexpr uint64_t kTimerEvent = kStopEvent - 1;
+constexpr size_t kMostAside = 3;  // queues of one batch that the reactor's thread runs itself
+constexpr Duration kShort = std::chrono::microseconds(50);  // … if they usually take no longer; otherwise one
 constexpr Duration kLongest = std::chrono::hours(24 * 365 * 20);  // keeps sums of times in range
 
 uint32_t epollEvents(unsigned events) {
@@ -41,6 +46,51 @@ uint32_t epollEvents(unsigned events) {
   if ((events & ready::oneShot) != 0) result |= EPOLLONESHOT;
   return result;
 }
+
+using QueuesAside = std::array<std::shared_ptr<SerialQueue>, kMostAside>;
+
+void submit(std::shared_ptr<SerialQueue> queue) {
+  Executor& executor = queue->executor();
+  executor.submit(std::move(queue));
+}
+
+// Queues that the leader borrowed from their executors. When one blocks, another thread takes the lead, and
+// the others go to their executors.
+class AsideRun final : public BlockingObserver {
+ public:
+  AsideRun(LeaderThreads& threads, QueuesAside queues) : threads_(threads), queues_(std::move(queues)) {}
+  ~AsideRun() override { submitRest(); }
+
+  [[nodiscard]] bool runNext() {  // false: this thread leads no longer
+    const std::shared_ptr<SerialQueue> queue = std::move(queues_[next_++]);
+    number_ = threads_.beginAside();
+    BlockingObserver* former = exchange(this);
+    queue->runPending();
+    exchange(former);
+    queue->executor().giveBack();
+    return threads_.endAside(number_);
+  }
+  [[nodiscard]] bool hasNext() const { return next_ < queues_.size() && queues_[next_] != nullptr; }
+
+ private:
+  void willBlock() override {
+    submitRest();
+    threads_.giveLeadAway(number_);
+  }
+  void hasBlocked() override {}
+  void submitRest() {
+    for (; hasNext(); ++next_) {
+      Executor& executor = queues_[next_]->executor();
+      executor.submit(std::move(queues_[next_]));
+      executor.giveBack();
+    }
+  }
+
+  LeaderThreads& threads_;
+  QueuesAside queues_;
+  size_t next_ = 0;
+  uint64_t number_ = 0;
+};
 
 unsigned readyBits(uint32_t events) {
   unsigned result = 0;
@@ -104,7 +154,8 @@ class EpollReactor::Timer final : public TimerHandle::State, public std::enable_
 
 class EpollReactor::Implementation : public std::enable_shared_from_this<Implementation> {
  public:
-  [[nodiscard]] bool start(const char* threadName);
+  explicit Implementation(const char* threadName) : threads_(threadName, [this] { run(); }) {}
+  [[nodiscard]] bool start();
   void stop();
   Watch watch(int descriptor, unsigned events, Handler handler);
   [[nodiscard]] bool modify(Registration& registration, unsigned events);
@@ -114,6 +165,7 @@ class EpollReactor::Implementation : public std::enable_shared_from_this<Impleme
                   Task work);
   void cancel(Timer& timer);
   [[nodiscard]] uint64_t wakeUps() const { return wakeUps_.load(std::memory_order_relaxed); }
+  [[nodiscard]] unsigned threads() { return threads_.threads(); }
 
  private:
   struct Slot {
@@ -123,6 +175,9 @@ class EpollReactor::Implementation : public std::enable_shared_from_this<Impleme
   using TimerKey = std::pair<MonotonicTime, uint64_t>;
 
   void run();
+  void handleEvents(int count);
+  [[nodiscard]] QueuesAside sortDeferred(Turn& turn);
+  [[nodiscard]] bool runAside(QueuesAside queues);
   void dispatch(uint64_t tag, uint32_t events);
   void fireTimers();
   [[nodiscard]] bool control(int operation, const Registration& registration) REQUIRES(mutex_);
@@ -131,16 +186,20 @@ class EpollReactor::Implementation : public std::enable_shared_from_this<Impleme
   void setAlarm() REQUIRES(mutex_);
 
   Descriptor epoll_, alarm_, stopEvent_;  // constant after start()
-  std::thread thread_;
-  std::atomic<std::thread::id> threadId_;
+  LeaderThreads threads_;
   std::atomic<uint64_t> wakeUps_{0};
   std::atomic<bool> stopping_{false};
+  // The leading thread's.
+  std::array<epoll_event, 128> events_;
+  MonotonicTime turnBegin_{};
+  Duration usualRun_ = kShort * 2;
 
   Mutex mutex_;
   ConditionVariable handlerDone_;
   std::vector<Slot> slots_ GUARDED_BY(mutex_);
   std::vector<uint32_t> freeSlots_ GUARDED_BY(mutex_);
   const Registration* running_ GUARDED_BY(mutex_) = nullptr;  // whose handler runs
+  std::thread::id runningOn_ GUARDED_BY(mutex_);
   unsigned awaitingHandler_ GUARDED_BY(mutex_) = 0;
   std::map<TimerKey, std::shared_ptr<Timer>> timersByDue_ GUARDED_BY(mutex_);
   std::set<TimerKey> timersByLatest_ GUARDED_BY(mutex_);
@@ -161,7 +220,7 @@ void EpollReactor::Timer::cancel() {
   reactor_->cancel(*this);
 }
 
-bool EpollReactor::Implementation::start(const char* threadName) {
+bool EpollReactor::Implementation::start() {
   epoll_ = ownDescriptor(epoll_create1(EPOLL_CLOEXEC));
   alarm_ = ownDescriptor(timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
   stopEvent_ = makeEventDescriptor();
@@ -173,25 +232,13 @@ bool EpollReactor::Implementation::start(const char* threadName) {
   event.events = EPOLLIN | EPOLLET;  // setting it anew clears it, so it is never read
   event.data.u64 = kTimerEvent;
   if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, alarm_.get(), &event) != 0) return false;
-  try {
-    thread_ = std::thread([this, threadName] {
-      beginServiceThread(threadName);
-      threadId_ = std::this_thread::get_id();
-      run();
-    });
-  } catch (const std::system_error& error) {
-    errno = error.code().value();
-    return false;
-  }
-  return true;
+  return threads_.start();
 }
 
 void EpollReactor::Implementation::stop() {
   stopping_ = true;
-  if (thread_.joinable()) {
-    signalEventDescriptor(stopEvent_.get());
-    thread_.join();
-  }
+  signalEventDescriptor(stopEvent_.get());
+  threads_.stop();
   std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Task>>>
       works;  // destroyed without the lock
   std::map<TimerKey, std::shared_ptr<Timer>> dropped;
@@ -205,21 +252,61 @@ void EpollReactor::Implementation::stop() {
 }
 
 void EpollReactor::Implementation::run() {
-  std::array<epoll_event, 128> events;
   while (!stopping_) {
-    const int count = epoll_wait(epoll_.get(), events.data(), static_cast<int>(events.size()), -1);
+    const int count = epoll_wait(epoll_.get(), events_.data(), static_cast<int>(events_.size()), -1);
     wakeUps_.fetch_add(1, std::memory_order_relaxed);
-    bool due = false;
-    for (int i = 0; i < count && !stopping_; ++i) {
-      const uint64_t tag = events[static_cast<size_t>(i)].data.u64;
-      if (tag == kTimerEvent) {
-        due = true;
-      } else if (tag != kStopEvent) {
-        dispatch(tag, events[static_cast<size_t>(i)].events);
-      }
+    QueuesAside queues;
+    {
+      Turn turn;
+      handleEvents(count);
+      queues = sortDeferred(turn);
     }
-    if (due && !stopping_) fireTimers();
+    if (queues[0] != nullptr && !runAside(std::move(queues))) return;
   }
+}
+
+void EpollReactor::Implementation::handleEvents(int count) {
+  bool due = false;
+  for (int i = 0; i < count && !stopping_; ++i) {
+    const epoll_event& event = events_[static_cast<size_t>(i)];
+    if (event.data.u64 == kTimerEvent) {
+      due = true;
+    } else if (event.data.u64 != kStopEvent) {
+      dispatch(event.data.u64, event.events);
+    }
+  }
+  if (due && !stopping_) fireTimers();
+}
+
+// Returns what to run here; everything else is with its executor.
+QueuesAside EpollReactor::Implementation::sortDeferred(Turn& turn) {
+  QueuesAside aside;
+  std::shared_ptr<SerialQueue> queue = turn.takeFirst();
+  if (!queue) return aside;
+  turnBegin_ = std::chrono::steady_clock::now();
+  size_t most = 0;
+  if (!stopping_ && threads_.mayRunAside(turnBegin_)) most = usualRun_ <= kShort ? kMostAside : 1;
+  for (size_t count = 0; queue != nullptr; queue = turn.takeFirst()) {
+    if (count < most && queue->executor().borrow()) {
+      aside[count++] = std::move(queue);
+    } else {
+      submit(std::move(queue));
+    }
+  }
+  return aside;
+}
+
+// False when another thread leads now: then nothing of the leading thread's may be touched.
+bool EpollReactor::Implementation::runAside(QueuesAside queues) {
+  AsideRun run(threads_, std::move(queues));
+  MonotonicTime begin = turnBegin_;
+  while (run.hasNext()) {
+    if (!run.runNext()) return false;
+    const MonotonicTime end = std::chrono::steady_clock::now();
+    usualRun_ += (end - begin - usualRun_) / 8;
+    begin = end;
+  }
+  return true;
 }
 
 void EpollReactor::Implementation::dispatch(uint64_t tag, uint32_t events) {
@@ -233,10 +320,12 @@ void EpollReactor::Implementation::dispatch(uint64_t tag, uint32_t events) {
     if (bits == 0) return;  // no longer asked for
     registration = slot.registration;
     running_ = registration.get();
+    runningOn_ = std::this_thread::get_id();
   }
   registration->handler_(bits);
   MutexLock lock(mutex_);
   running_ = nullptr;
+  runningOn_ = {};
   if (awaitingHandler_ > 0) handlerDone_.notifyAll();
 }
 
@@ -286,7 +375,7 @@ void EpollReactor::Implementation::cancel(Registration& registration) {
   dropped = std::move(slot.registration);
   ++slot.generation;
   freeSlots_.push_back(registration.slot_);
-  if (threadId_.load() == std::this_thread::get_id()) return;
+  if (runningOn_ == std::this_thread::get_id()) return;
   ++awaitingHandler_;
   while (running_ == &registration) handlerDone_.wait(mutex_);
   --awaitingHandler_;
@@ -362,8 +451,8 @@ void EpollReactor::Implementation::fireTimers() {
 }
 
 std::unique_ptr<EpollReactor> EpollReactor::create(const char* threadName) {
-  auto implementation = std::make_shared<Implementation>();
-  if (!implementation->start(threadName)) return nullptr;
+  auto implementation = std::make_shared<Implementation>(threadName);
+  if (!implementation->start()) return nullptr;
   return std::unique_ptr<EpollReactor>(new EpollReactor(std::move(implementation)));
 }
 
@@ -377,6 +466,10 @@ void EpollReactor::stop() {
 }
 uint64_t EpollReactor::wakeUps() const {
   return implementation_->wakeUps();
+}
+
+unsigned EpollReactor::threads() const {
+  return implementation_->threads();
 }
 
 Watch EpollReactor::watch(int descriptor, unsigned events, Handler handler) {

@@ -3,6 +3,11 @@
 // that suits every timer's leeway; setting or cancelling a timer costs a system call only when that moment
 // changes, and wakes nobody.
 //
+// What a handler or a timer gives to an idle queue is run by the reactor's own thread when such events are
+// frequent but short, for then the wake-up of a worker would cost more than the work. When that work blocks,
+// or takes longer than some 20 ms, another thread of the same name goes on waiting for events
+// (LeaderThreads); busy queues move to their executor with their first unfinished turn.
+//
 // create() starts the thread, so a program that confines itself does that first. Watches and timers may
 // outlive the reactor; they are silent then.
 #pragma once
@@ -25,11 +30,14 @@ class EpollReactor final : public Reactor, public TimerService {
   TimerHandle after(Duration delay, std::shared_ptr<SerialQueue> queue, Task work) override;
   TimerHandle every(Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue, Task work) override;
 
-  // Ends the thread after the handler that runs; no handler and no timer runs afterwards. Not from a handler.
+  // Ends its threads after the handler and the queues that they run; no handler and no timer runs afterwards.
+  // Not from a handler, nor from work that may run on its threads.
   void stop();
 
   // How often the thread has woken up.
   [[nodiscard]] uint64_t wakeUps() const;
+  // One, or a few while work is run here.
+  [[nodiscard]] unsigned threads() const;
 
  private:
   class Implementation;

@@ -237,7 +237,10 @@ TEST_F(EpollReactorTest, IsSilentAfterStopAndWatchesMayOutliveIt) {
 
 class EpollTimersTest : public EpollReactorTest {
  protected:
-  ~EpollTimersTest() override { pool_.shutDown(); }
+  ~EpollTimersTest() override {
+    reactor_->stop();  // it submits to the pool
+    pool_.shutDown();
+  }
   WorkerPool pool_{WorkerPoolOptions{}};
   std::shared_ptr<SerialQueue> queue_ = SerialQueue::create("test", pool_);
 };
