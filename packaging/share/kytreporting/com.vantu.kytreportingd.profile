@@ -1,6 +1,7 @@
 # What kytreportingd may do with files once it runs (TOML). Everything beneath a path of `read` may be read and listed;
-# beneath a path of `write` files may also be made, written, renamed and removed. Nothing may be executed. A path of
-# `read` that does not exist is left out; one of `write` must exist. A variable stands only at the beginning:
+# beneath a path of `write` files may also be made, written, renamed and removed; beneath one of `sockets` sockets may be
+# made and removed. Nothing may be executed. A path of `read` that does not exist is left out; the others must exist. A
+# variable stands only at the beginning:
 #
 #   ${CONFIG}   /etc/kytreportingd            ${STATE}    /var/lib/kytreportingd/defaults
 #   ${SHARE}    <share>/kytreporting          ${RUN}      /run/kytreportingd
@@ -43,6 +44,9 @@ read = [
 write = [
   "${STATE}",
   "${LOGS}",
-  "${RUN}",
   "/dev/null",
+]
+
+sockets = [
+  "${RUN}",
 ]

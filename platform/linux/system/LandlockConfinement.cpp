@@ -28,6 +28,7 @@ struct RulesetAttributes {
 constexpr uint64_t kRead = LANDLOCK_ACCESS_FS_READ_FILE | LANDLOCK_ACCESS_FS_READ_DIR;
 constexpr uint64_t kWrite = kRead | LANDLOCK_ACCESS_FS_WRITE_FILE | LANDLOCK_ACCESS_FS_REMOVE_FILE |
                             LANDLOCK_ACCESS_FS_MAKE_REG | kTruncate;
+constexpr uint64_t kSockets = kRead | LANDLOCK_ACCESS_FS_REMOVE_FILE | LANDLOCK_ACCESS_FS_MAKE_SOCK;
 // A rule for something else than a folder may name only these.
 constexpr uint64_t kOfFiles = LANDLOCK_ACCESS_FS_EXECUTE | LANDLOCK_ACCESS_FS_WRITE_FILE |
                               LANDLOCK_ACCESS_FS_READ_FILE | kTruncate | kDeviceControl;
@@ -96,7 +97,11 @@ std::variant<ConfinementProfile, TomlError> parseProfile(std::string_view text, 
   if (auto* error = std::get_if<TomlError>(&parsed)) return std::move(*error);
   ConfinementProfile profile;
   for (const auto& [key, node] : std::get<TomlTable>(parsed)) {
-    if (key != "read" && key != "write") return tomlError(name, node.line, "unknown key \"" + key + "\"");
+    std::vector<std::string>* paths = key == "read"      ? &profile.read
+                                      : key == "write"   ? &profile.write
+                                      : key == "sockets" ? &profile.sockets
+                                                         : nullptr;
+    if (paths == nullptr) return tomlError(name, node.line, "unknown key \"" + key + "\"");
     if (node.array() == nullptr)
       return tomlError(name, node.line, "\"" + key + "\" must be an array of texts");
     for (const TomlNode& entry : *node.array()) {
@@ -104,7 +109,7 @@ std::variant<ConfinementProfile, TomlError> parseProfile(std::string_view text, 
         return tomlError(name, entry.line, "\"" + key + "\" must be an array of texts");
       auto [path, wrong] = expanded(*entry.text(), variables);
       if (wrong != nullptr) return tomlError(name, entry.line, "\"" + *entry.text() + "\" " + wrong);
-      if (!path.empty()) (key == "read" ? profile.read : profile.write).push_back(std::move(path));
+      if (!path.empty()) paths->push_back(std::move(path));
     }
   }
   return profile;
@@ -134,6 +139,9 @@ std::optional<std::string> LandlockConfinement::enter(std::string_view profileNa
   }
   for (const std::string& path : profile.write) {
     if (auto error = allow(ruleset.get(), path, kWrite & known, false)) return error;
+  }
+  for (const std::string& path : profile.sockets) {
+    if (auto error = allow(ruleset.get(), path, kSockets & known, false)) return error;
   }
   if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return failed("no_new_privs", errno);
   if (!kSanitized && ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0) != 0) return failed("dumpable", errno);

@@ -1,12 +1,13 @@
 // Confinement by profile: what the process may do with files, from a list of folders that a profile file
 // names.
 //
-// The profile `NAME.profile` is a TOML file with the arrays `read` and `write`. Their entries are absolute
-// paths, or begin with a variable ("${STATE}/…"), whose values the composition root knows. Everything beneath
-// `read` may be read and listed; beneath `write` also written, created, renamed and removed (files, not
-// folders); nothing may be executed, linked into other folders or made a device or a socket. A path of `read`
-// that does not exist is left out, one of `write` must exist. Where the kernel can, binding TCP ports is
-// forbidden too; connecting is not, since storebags decide the addresses.
+// The profile `NAME.profile` is a TOML file with the arrays `read`, `write` and `sockets`. Their entries are
+// absolute paths, or begin with a variable ("${STATE}/…"), whose values the composition root knows.
+// Everything beneath `read` may be read and listed; beneath `write` also written, created, renamed and
+// removed (files, not folders); beneath `sockets` sockets may be made and removed; nothing may be executed,
+// linked into other folders or made a device, and nowhere else a socket. A path of `read` that does not exist
+// is left out, the others must exist. Where the kernel can, binding TCP ports is forbidden too; connecting is
+// not, since storebags decide the addresses.
 //
 // Files that are open before stay usable. What is entered holds for the calling thread and those it starts,
 // for ever, so it is entered before any thread exists. The process also gives up gaining privileges
@@ -27,7 +28,7 @@
 namespace kyt {
 
 struct ConfinementProfile {
-  std::vector<std::string> read, write;
+  std::vector<std::string> read, write, sockets;
 };
 
 using ProfileVariables = std::map<std::string, std::string, std::less<>>;

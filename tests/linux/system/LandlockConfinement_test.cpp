@@ -9,6 +9,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <cstring>
@@ -34,6 +35,15 @@ int openError(const std::string& path, int flags) {
 
 int errorOf(int result) {
   return result == 0 ? 0 : errno;
+}
+
+// 0, or errno of binding a Unix socket there.
+int makeSocket(const std::string& path) {
+  const FileHandle socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  path.copy(address.sun_path, sizeof address.sun_path - 1);
+  return errorOf(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address));
 }
 
 std::string expectError(const char* what, int actual, int expected) {
@@ -247,7 +257,10 @@ TEST_F(LandlockConfinementTest, TheShippedProfileLetsTheDaemonWorkAndNoMore) {
                 wrong += expectError(name, openError(file, O_RDONLY), 0);
                 wrong += expectError(name, openError(file, O_WRONLY), EACCES);
               }
-              for (const char* name : {"state", "logs", "run"}) {
+              wrong += expectError("socket", makeSocket(folder_ / "run/socket"), 0);
+              wrong += expectError("stale socket", errorOf(::unlink((folder_ / "run/socket").c_str())), 0);
+              wrong += expectError("socket elsewhere", makeSocket(folder_ / "state/socket"), EACCES);
+              for (const char* name : {"state", "logs"}) {
                 const std::string file = folder_ / (std::string(name) + "/file");
                 wrong += expectError(name, openError(file, O_RDWR), 0);
                 wrong += expectError(name, errorOf(::unlink(file.c_str())), 0);

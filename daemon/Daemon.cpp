@@ -1,0 +1,128 @@
+#include "daemon/Daemon.h"
+
+#include <memory>
+#include <utility>
+#include <variant>
+
+#include "daemon/DaemonServices.h"
+#include "platform/Keys.h"
+#include "platform/Paths.h"
+#include "platform/Settings.h"
+#include "platform/linux/base/EpollReactor.h"
+#include "platform/linux/base/StopSignals.h"
+#include "platform/linux/base/UnixSocket.h"
+#include "platform/linux/system/Files.h"
+#include "platform/linux/system/LandlockConfinement.h"
+#include "platform/linux/system/LogSinks.h"
+#include "platform/linux/system/Process.h"
+#include "platform/linux/system/ProgramInspector.h"
+#include "platform/linux/system/ServiceManager.h"
+#include "platform/linux/system/TomlSettings.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr int kCouldNotStart = 1;
+constexpr int kNotConfined = -1;
+constexpr uint32_t kFolderMode = 0755;
+
+// The folders that the daemon writes to, which the confinement names, so they must exist before it.
+std::optional<std::string> makeMissingFolders(const Paths& paths) {
+  for (const std::string& folder : {paths.run(), paths.userDefaults(), paths.messageLogs()})
+    if (auto error = makeFolders(folder, kFolderMode)) return error;
+  return std::nullopt;
+}
+
+LandlockConfinement confinement(const Paths& paths, const Settings& settings) {
+  return LandlockConfinement(paths.kytShare(),
+                             {{"CONFIG", paths.configuration()},
+                              {"SHARE", paths.kytShare()},
+                              {"PLUGINS", paths.plugIns()},
+                              {"STATE", paths.userDefaults()},
+                              {"LOGS", paths.messageLogs()},
+                              {"RUN", paths.run()},
+                              {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
+}
+
+// The socket that the service manager handed over, or one of our own.
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> listeningSocket(const Paths& paths) {
+  auto activated = UnixSocketAcceptor::adoptActivated();
+  const auto* adopted = std::get_if<std::unique_ptr<UnixSocketAcceptor>>(&activated);
+  if (adopted == nullptr || *adopted != nullptr) return activated;
+  return UnixSocketAcceptor::bindAt(paths.socket());
+}
+
+// Which programs peers run is asked by a process outside the confinement; without it, grants that name an
+// executable match nobody.
+std::unique_ptr<ProgramInspector> programInspector(Log& log) {
+  auto started = ProgramInspectorProcess::start();
+  if (const auto* error = std::get_if<std::string>(&started)) {
+    log.error("main: Cannot look at the programs of clients: %s", error->c_str());
+    return std::make_unique<DirectProgramInspector>();
+  }
+  return std::move(std::get<std::unique_ptr<ProgramInspectorProcess>>(started));
+}
+
+int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspector& inspector,
+          StopSignals& stopSignals) {
+  auto socket = listeningSocket(paths);
+  if (const Error* error = std::get_if<Error>(&socket)) {
+    log.error("main: %s", error->localizedDescription.c_str());
+    return kCouldNotStart;
+  }
+  auto& acceptor = std::get<std::unique_ptr<UnixSocketAcceptor>>(socket);
+  const bool activated = acceptor->activated();
+  std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
+  if (reactor == nullptr) {
+    log.error("main: Cannot start the reactor");
+    return kCouldNotStart;
+  }
+  DaemonServices services({settings, paths, log, inspector, std::move(reactor), std::move(acceptor),
+                           activated, [&stopSignals] { stopSignals.request(); }});
+  services.resume();
+  log.normal("main: Listener resumes with sandbox, start loop.");
+  ServiceManager::ready("Listening");
+  const int signal = stopSignals.wait();
+  ServiceManager::stopping();
+  if (signal != 0)
+    log.normal("main: Ending on signal %d", signal);
+  else
+    log.normal("main: Ending, idle for %g seconds", settings.limits.idleExitSeconds);
+  services.shutDown();
+  return 0;
+}
+
+}  // namespace
+
+int runDaemon(const DaemonOptions& options) {
+  StderrSink standardError;
+  Log log(standardError, options.logLevel);
+  const Paths paths = Paths::of(absolutePath(options.root), executableFolder());
+  const std::string config = options.config.empty() ? paths.settings() : absolutePath(options.config);
+  const auto read = readSettings(config);
+  if (const auto* error = std::get_if<TomlError>(&read)) {
+    log.error("main: %s", error->text.c_str());
+    return kCouldNotStart;
+  }
+  const Settings& settings = std::get<Settings>(read);
+  const std::unique_ptr<LogSink> sink = makeLogSink(settings.logTarget);
+  log.setSink(*sink);
+  if (auto error = makeMissingFolders(paths)) {
+    log.error("main: %s", error->c_str());
+    return kCouldNotStart;
+  }
+
+  // The service class is inherited by every thread that starts later.
+  if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
+  StopSignals stopSignals;
+  log.normal("startLogging: Daemon starts logging...");
+  const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
+  if (const auto error = confinement(paths, settings).enter(kServiceName)) {
+    log.error("main: confine_init() fails: %s\n", error->c_str());
+    return kNotConfined;
+  }
+  return serve(settings, paths, log, *inspector, stopSignals);
+}
+
+}  // namespace kyt

@@ -1,0 +1,195 @@
+#include "daemon/DaemonServices.h"
+
+#include <chrono>
+#include <utility>
+
+#include "backends/BackendTable.h"
+#include "platform/Semaphore.h"
+#include "platform/linux/base/Threads.h"
+#include "platform/linux/system/Process.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr Duration kPollPeriod =
+    std::chrono::milliseconds(5);  // of what has no event of its own, at the end only
+constexpr Duration kCancelGrace = std::chrono::seconds(1);  // for what was cancelled to call its completions
+
+WorkerPoolOptions workerPoolOptions() {
+  WorkerPoolOptions options;
+  options.maxWorkers = Limits::maxWorkers;
+  options.nameThread = beginServiceThread;
+  return options;
+}
+
+CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
+  CurlURLSessionOptions options;
+  options.certificateFile = settings.caFile;
+  options.cellularInterfaces = settings.cellularInterfaces;
+  return options;
+}
+
+DeviceSources deviceSources(const Paths& paths) {
+  DeviceSources sources;
+  sources.overrides = paths.device();
+  return sources;
+}
+
+// Under a private root, files of the daemon's own user may grant entitlements too.
+TomlEntitlementsOptions entitlementsOptions(const Paths& paths) {
+  TomlEntitlementsOptions options{paths.entitlements(), std::nullopt};
+  if (!paths.root.empty()) options.trustedUser = currentUser();
+  return options;
+}
+
+// What the wire protocol calls the machine's identifier: 32 hexadecimal digits that stay the same on this
+// device and tell nothing about it, since any client may ask for them.
+std::string wireMachineId(DeviceIdentity& identity, Cryptography& cryptography) {
+  char deviceID[kDeviceIDSize] = {};
+  identity.deviceUniqueIDCString(deviceID, kDeviceIDSize);
+  const std::string text = std::string("com.vantu.kytreportingd ") + deviceID;
+  const auto digest = cryptography.sha256(std::as_bytes(std::span(text)));
+  constexpr char digits[] = "0123456789abcdef";
+  std::string id;
+  for (size_t i = 0; i < 16; ++i) {
+    const auto byte = std::to_integer<unsigned>(digest[i]);
+    id += digits[byte >> 4];
+    id += digits[byte & 15];
+  }
+  return id;
+}
+
+}  // namespace
+
+class DaemonServices::Deadline {
+ public:
+  Deadline(Clock& clock, double seconds)
+      : clock_(clock),
+        end_(clock.monotonic() +
+             std::chrono::duration_cast<Duration>(std::chrono::duration<double>(seconds))) {}
+  [[nodiscard]] Duration left() const { return std::max(Duration(0), end_ - clock_.monotonic()); }
+  // Whether the condition held before the end, and `grace` after it at the latest.
+  template <typename Condition>
+  [[nodiscard]] bool waitUntil(Condition condition, Duration grace = Duration(0)) const {
+    Semaphore never;
+    while (!condition()) {
+      if (clock_.monotonic() >= end_ + grace) return false;
+      static_cast<void>(never.waitFor(kPollPeriod));
+    }
+    return true;
+  }
+
+ private:
+  Clock& clock_;
+  const MonotonicTime end_;
+};
+
+DaemonServices::DaemonServices(Start start)
+    : settings_(start.settings),
+      log_(start.log),
+      idle_(std::move(start.idle)),
+      reactor_(std::move(start.reactor)),
+      workers_(workerPoolOptions()),
+      userDefaults_({start.paths.userDefaults()}, log_, counters_, clock_),
+      deviceProperties_(deviceSources(start.paths), cryptography_, log_),
+      consent_(userDefaults_),
+      clientBundle_(start.paths.clientBundle(), log_),
+      daemonBundle_(start.paths.daemonBundle(), log_),
+      entitlements_(entitlementsOptions(start.paths), start.inspector, log_, counters_),
+      urlSessions_(urlSessionOptions(settings_), log_, counters_),
+      platform_{settings_.limits,
+                counters_,
+                log_,
+                clock_,
+                *reactor_,
+                workers_,
+                random_,
+                userDefaults_,
+                deviceProperties_,
+                consent_,
+                cryptography_,
+                propertyLists_,
+                json_,
+                deflate_,
+                memory_,
+                urlSessions_,
+                clientBundle_,
+                daemonBundle_},
+      deviceIdentity_(platform_),
+      environment_(platform_, deviceIdentity_,
+                   StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
+      configuration_{platform_, deviceIdentity_, environment_},
+      backendFactory_(configuration_, backendTable(configuration_)),
+      fetcher_(configuration_, backendClassLock_),
+      sessionClass_(configuration_, backendFactory_, messageLog_),
+      queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),
+      transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *reactor_, queue_,
+                   [this] { return isIdle(); }),
+      agent_(configuration_, fetcher_, sessionClass_, transaction_),
+      listener_(DBusServerServices{settings_.limits, counters_, log_, clock_, *reactor_, workers_, *reactor_,
+                                   entitlements_, wireMachineId(deviceIdentity_, cryptography_)},
+                std::move(start.acceptor)) {
+  listener_.setDelegate(agent_);
+}
+
+DaemonServices::~DaemonServices() = default;
+
+void DaemonServices::resume() {
+  listener_.resume();
+}
+
+// The idle time counts anew from the end of what a session left behind.
+bool DaemonServices::isIdle() {
+  if (agent_.sessionCount() != 0 || urlSessions_.outstanding() != 0) return false;
+  idle_();
+  return true;
+}
+
+void DaemonServices::shutDown() {
+  const Deadline deadline(clock_, settings_.limits.shutdownGraceSeconds);
+  listener_.stopAccepting();
+  // Before anything that needs the agent's monitor, which a download holds.
+  fetcher_.cancel();
+  endSessions(deadline);
+  waitForRequests(deadline);
+  if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
+    listener_.invalidateConnections();
+  workers_.shutDown();
+  reactor_->stop();
+  logFigures();
+}
+
+void DaemonServices::endSessions(const Deadline& deadline) {
+  agent_.finishAllSessions();
+  if (agent_.waitUntilSessionsHaveEnded(deadline.left())) return;
+  log_.error("shutDown: Sessions have not ended in time, cancelling what they wait for");
+  urlSessions_.cancelAll();
+  listener_.invalidateConnections();
+  static_cast<void>(agent_.waitUntilSessionsHaveEnded(kCancelGrace));
+}
+
+void DaemonServices::waitForRequests(const Deadline& deadline) {
+  const auto done = [this] { return urlSessions_.outstanding() == 0; };
+  if (deadline.waitUntil(done)) return;
+  log_.error("shutDown: Cancelling %zu requests that have not been answered in time",
+             urlSessions_.outstanding());
+  urlSessions_.cancelAll();
+  static_cast<void>(deadline.waitUntil(done, kCancelGrace));
+}
+
+void DaemonServices::logFigures() {
+  const URLFigures figures = urlSessions_.figures();
+  log_.normal("shutDown: %llu requests started, %llu completed, %llu failed",
+              static_cast<unsigned long long>(figures.started),
+              static_cast<unsigned long long>(figures.completed),
+              static_cast<unsigned long long>(figures.failed));
+  for (size_t i = 0; i < static_cast<size_t>(Reason::numberOfReasons); ++i) {
+    const auto reason = static_cast<Reason>(i);
+    if (counters_.value(reason) != 0)
+      log_.normal("shutDown: %s: %llu", reasonName(reason),
+                  static_cast<unsigned long long>(counters_.value(reason)));
+  }
+}
+
+}  // namespace kyt

@@ -1,0 +1,111 @@
+// Every object of the running daemon, in the order in which each needs those before it; they are destroyed in
+// reverse. Made by runDaemon() after the process is confined.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "backend/BackendFactory.h"
+#include "config/Configuration.h"
+#include "config/DeviceIdentity.h"
+#include "config/Environment.h"
+#include "config/StorebagFetcher.h"
+#include "daemon/ReportingdAgent.h"
+#include "platform/Counters.h"
+#include "platform/Entitlements.h"
+#include "platform/Log.h"
+#include "platform/Mutex.h"
+#include "platform/Paths.h"
+#include "platform/Platform.h"
+#include "platform/SerialQueue.h"
+#include "platform/Settings.h"
+#include "platform/WorkerPool.h"
+#include "platform/ipc/DBusServer.h"
+#include "platform/linux/LinuxMemoryInfo.h"
+#include "platform/linux/LinuxRandom.h"
+#include "platform/linux/OpenSSLCryptography.h"
+#include "platform/linux/PugixmlPropertyLists.h"
+#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/ZlibDeflate.h"
+#include "platform/linux/base/EpollReactor.h"
+#include "platform/linux/base/LinuxClock.h"
+#include "platform/linux/system/LinuxDeviceProperties.h"
+#include "platform/linux/system/ProgramInspector.h"
+#include "platform/linux/system/ServiceManager.h"
+#include "platform/linux/system/TomlBundle.h"
+#include "platform/linux/system/TomlEntitlements.h"
+#include "platform/linux/system/TomlUserDefaults.h"
+#include "platform/linux/url/CurlUrlSession.h"
+#include "session/MessageLog.h"
+#include "session/ReportingdSessionClass.h"
+
+namespace kyt {
+
+class DaemonServices {
+ public:
+  struct Start {
+    const Settings& settings;
+    const Paths& paths;
+    Log& log;
+    ProgramInspector& inspector;
+    std::unique_ptr<EpollReactor> reactor;
+    std::unique_ptr<StreamAcceptor> acceptor;
+    bool socketActivated = false;
+    // The daemon has been idle for long enough and nothing is outstanding. Any thread.
+    std::function<void()> idle;
+  };
+  explicit DaemonServices(Start start);
+  ~DaemonServices();
+  DaemonServices(const DaemonServices&) = delete;
+  DaemonServices& operator=(const DaemonServices&) = delete;
+
+  // The listener takes connections from now on.
+  void resume();
+  // The orderly end: refuses new work, ends every session on its queue, waits for outstanding requests, all
+  // under one deadline, and ends all threads. Once, on the main thread.
+  void shutDown();
+
+ private:
+  class Deadline;
+  [[nodiscard]] bool isIdle();
+  void endSessions(const Deadline& deadline);
+  void waitForRequests(const Deadline& deadline);
+  void logFigures();
+
+  const Settings& settings_;
+  Log& log_;
+  const std::function<void()> idle_;
+  Counters counters_;
+  LinuxClock clock_;
+  std::unique_ptr<EpollReactor> reactor_;
+  WorkerPool workers_;
+  LinuxRandom random_;
+  LinuxMemoryInfo memory_;
+  OpenSSLCryptography cryptography_;
+  PugixmlPropertyLists propertyLists_;
+  RapidJSONWriter json_;
+  ZlibDeflate deflate_;
+  TomlUserDefaults userDefaults_;
+  LinuxDeviceProperties deviceProperties_;
+  DefaultsDiagnosticsConsent consent_;
+  TomlBundle clientBundle_, daemonBundle_;
+  TomlEntitlements entitlements_;
+  CurlURLSessionFactory urlSessions_;
+  Platform platform_;
+
+  DeviceIdentity deviceIdentity_;
+  Environment environment_;
+  Configuration configuration_;
+  DefaultBackendFactory backendFactory_;
+  DisabledMessageLog messageLog_;
+  Mutex backendClassLock_;
+  StorebagFetcher fetcher_;
+  ReportingdSessionClass sessionClass_;
+  std::shared_ptr<SerialQueue> queue_;  // the daemon's own
+  LinuxProcessTransaction transaction_;
+  ReportingdAgent agent_;
+  DBusServer listener_;
+};
+
+}  // namespace kyt

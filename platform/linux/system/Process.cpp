@@ -1,0 +1,33 @@
+#include "platform/linux/system/Process.h"
+
+#include <unistd.h>
+
+#include <filesystem>
+#include <system_error>
+
+namespace kyt {
+
+std::string executableFolder() {
+  std::error_code error;
+  const auto program = std::filesystem::read_symlink("/proc/self/exe", error);
+  return error ? std::string() : program.parent_path().string();
+}
+
+std::string absolutePath(const std::string& path) {
+  if (path.empty()) return path;
+  std::error_code error;
+  auto absolute = std::filesystem::absolute(path, error).lexically_normal().string();
+  if (error) return path;
+  while (absolute.size() > 1 && absolute.back() == '/') absolute.pop_back();
+  return absolute;
+}
+
+std::string folderOf(const std::string& path) {
+  return std::filesystem::path(path).parent_path().string();
+}
+
+uint32_t currentUser() {
+  return ::geteuid();
+}
+
+}  // namespace kyt
