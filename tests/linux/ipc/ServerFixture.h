@@ -1,0 +1,337 @@
+// A whole IPC server on a socket in a temporary folder, with the real reactor and worker pool and a session
+// that records its calls, and a plain client socket to speak to it byte by byte.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Counters.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/Mutex.h"
+#include "platform/WorkerPool.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "platform/ipc/BodyReader.h"
+#include "platform/ipc/DBusServer.h"
+#include "platform/ipc/Handshake.h"
+#include "platform/ipc/MessageWriter.h"
+#include "platform/linux/base/Descriptors.h"
+#include "platform/linux/base/EpollReactor.h"
+#include "platform/linux/base/LinuxClock.h"
+#include "platform/linux/base/UnixSocket.h"
+#include "tests/support/Eventually.h"
+
+namespace kyt::test {
+
+inline constexpr const char* kMachineId = "00112233445566778899aabbccddeeff";
+
+// Records what is called, and answers at once, or never when `holding`.
+class RecordingSession final : public ClientSessionInterface {
+ public:
+  explicit RecordingSession(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) {}
+  void setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo, Value frameworks,
+                      bool aggregation) override {
+    note("setSessionInfo " + description(sessionInfo) + " " + (userInfo ? description(*userInfo) : "none") +
+         " " + description(frameworks) + (aggregation ? " yes" : " no"));
+  }
+  void startConfigWithCompletionHandler(StatesReply reply) override {
+    note("startConfig");
+    answerOrHold(std::move(reply), std::optional<Array>(Array{"httppost", "dashboard"}));
+  }
+  void fetchStatesWithUserInfo(std::optional<Dictionary> userInfo, StatesReply reply) override {
+    note("fetchStates " + (userInfo ? description(*userInfo) : std::string("none")));
+    answerOrHold(std::move(reply), std::optional<Array>());
+  }
+  void fetchDisplayURL(StringReply reply) override {
+    note("fetchDisplayURL");
+    answerOrHold(std::move(reply), String(std::string(displayURLBytes, 'u')));
+  }
+  void sendMessageWithDictionary(Dictionary message, ObjectReply reply) override {
+    ++events;
+    note("sendMessage " + description(message) + (reply ? " replies" : ""));
+    if (dropsReplies) return;
+    if (reply) answerOrHold(std::move(reply), Value(message));
+  }
+  void flushMessagesWithCompletion(ResultReply completion) override {
+    note("flush");
+    completion(Value(true), Error{"domain", 7, "text"});
+  }
+  void finishSessionGracefully() override { note("finish"); }
+  void uploadFileAtPath(String fileURL, String token, std::optional<FileExtension> extension,
+                        SuccessReply reply) override {
+    std::string contents = "none";
+    if (extension) {
+      char buffer[64];
+      const ssize_t count = ::pread(extension->file.get(), buffer, sizeof buffer, 0);
+      contents.assign(buffer, count < 0 ? 0 : static_cast<size_t>(count));
+    }
+    note("upload " + fileURL.str() + " " + token.str() + " " + contents);
+    reply(extension.has_value());
+  }
+  void uploadLogData(Value logData, SuccessErrorReply reply) override {
+    note("uploadLogData " + description(logData));
+    reply(false, Error{"domain", -1, "no"});
+  }
+  void sendMessageWithSessionInfo(Dictionary sessionInfo, std::optional<Dictionary>, uint16_t category,
+                                  uint16_t type, std::optional<Dictionary> payload,
+                                  StringReply reply) override {
+    note("sendWithInfo " + description(sessionInfo) + " " + std::to_string(category) + " " +
+         std::to_string(type) + " " + (payload ? description(*payload) : "none"));
+    reply("status");
+  }
+  void updateSharedDataWithDictionary(Dictionary sharedData) override {
+    note("shared " + description(sharedData));
+  }
+  void updateSharedDataForKey(String key, Value value) override {
+    note("sharedKey " + key.str() + " " + description(value));
+  }
+  void setDigestKey(Data key, int32_t algorithm) override {
+    note("digest " + std::string(key.view()) + " " + std::to_string(algorithm));
+  }
+
+  void note(std::string text) {
+    MutexLock lock(mutex_);
+    notes_.push_back(std::move(text));
+  }
+  [[nodiscard]] std::vector<std::string> notes() {
+    MutexLock lock(mutex_);
+    return notes_;
+  }
+  [[nodiscard]] bool has(const std::string& text) {
+    for (const std::string& note : notes()) {
+      if (note == text) return true;
+    }
+    return false;
+  }
+  Connection& connection() { return *connection_; }
+
+  std::atomic<int> events{0};
+  std::atomic<bool> dropsReplies{false};
+  std::atomic<size_t> displayURLBytes{12};
+
+ private:
+  template <typename Reply, typename Answer>
+  void answerOrHold(Reply reply, Answer answer) {
+    reply(std::move(answer));
+  }
+  Mutex mutex_;
+  std::vector<std::string> notes_ GUARDED_BY(mutex_);
+  std::shared_ptr<Connection> connection_;
+};
+
+class FixedEntitlements final : public Entitlements {
+ public:
+  std::atomic<bool> entitled{true};
+  Value valueFor(const PeerCredentials& peer, std::string_view key) override {
+    return key == "com.vantu.private.kytreportingd" && peer.uid == ::getuid() ? Value(entitled.load())
+                                                                              : Value();
+  }
+};
+
+class Server final : public ListenerDelegate {
+ public:
+  explicit Server(Limits given = {}) : limits(given) {
+    char name[] = "/tmp/kyt-ipc-XXXXXX";
+    folder = ::mkdtemp(name);
+    path = folder + "/socket";
+    reactor = EpollReactor::create();
+    auto bound = UnixSocketAcceptor::bindAt(path);
+    listener = std::make_unique<DBusServer>(
+        DBusServerServices{limits, counters, log, clock, *reactor, pool, *reactor, entitlements, kMachineId},
+        std::move(std::get<0>(bound)));
+    listener->setDelegate(*this);
+    listener->resume();
+  }
+  ~Server() override {
+    listener->stopAccepting();
+    listener->invalidateConnections();
+    EXPECT_TRUE(eventually([&] { return listener->connectionCount() == 0; }));
+    reactor->stop();
+    pool.shutDown();
+    listener.reset();
+    std::filesystem::remove_all(folder);
+  }
+  bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
+    if (!connection->entitlementValue("com.vantu.private.kytreportingd").boolValue()) return false;
+    auto session = std::make_shared<RecordingSession>(connection);
+    connection->setExportedObject(session);
+    connection->setInterruptionHandler([session] { session->note("interrupted"); });
+    connection->setInvalidationHandler([this, session] {
+      session->note("invalidated");
+      ++invalidations;
+    });
+    connection->resume();
+    MutexLock lock(mutex_);
+    sessions_.push_back(session);
+    if (keepsNothing) sessions_.clear();
+    ++accepted;
+    return true;
+  }
+  // The session of the n-th accepted connection; waits for it.
+  std::shared_ptr<RecordingSession> session(size_t index = 0) {
+    std::shared_ptr<RecordingSession> found;
+    EXPECT_TRUE(eventually([&] {
+      MutexLock lock(mutex_);
+      if (sessions_.size() <= index) return false;
+      found = sessions_[index];
+      return true;
+    }));
+    return found;
+  }
+  [[nodiscard]] uint64_t counted(Reason reason) const { return counters.value(reason); }
+
+  const Limits limits;
+  std::string folder, path;
+  Counters counters;
+  MemoryLogSink sink;
+  Log log{sink, LogLevel::debug};
+  LinuxClock clock;
+  FixedEntitlements entitlements;
+  std::atomic<int> accepted{0}, invalidations{0};
+  std::atomic<bool> keepsNothing{false};
+  WorkerPool pool{WorkerPoolOptions{}};
+  std::unique_ptr<EpollReactor> reactor;
+  std::unique_ptr<DBusServer> listener;
+
+ private:
+  Mutex mutex_;
+  std::vector<std::shared_ptr<RecordingSession>> sessions_ GUARDED_BY(mutex_);
+};
+
+// A client that says exactly what it is told to.
+class PlainClient {
+ public:
+  explicit PlainClient(const std::string& path) {
+    socket_ = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::memcpy(address.sun_path, path.data(), path.size());
+    connected_ = ::connect(socket_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+  }
+  [[nodiscard]] bool connected() const { return connected_; }
+  [[nodiscard]] int descriptor() const { return socket_.get(); }
+  // Handshakes and leaves nothing of it to be read.
+  bool shakeHands() {
+    send(ClientHandshake::opening(::getuid()));
+    ClientHandshake handshake;
+    while (true) {
+      if (!fill()) return false;
+      size_t consumed = 0;
+      const auto status = handshake.feed(std::as_bytes(std::span(received_)), consumed);
+      received_.erase(0, consumed);
+      if (status != ClientHandshake::Status::goingOn) return status == ClientHandshake::Status::done;
+    }
+  }
+  bool send(std::string_view bytes, const std::vector<int>& descriptors = {}) {
+    while (!bytes.empty()) {
+      iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
+      std::vector<char> control(CMSG_SPACE(sizeof(int) * descriptors.size()));
+      msghdr message{};
+      message.msg_iov = &piece;
+      message.msg_iovlen = 1;
+      if (!descriptors.empty()) {
+        message.msg_control = control.data();
+        message.msg_controllen = control.size();
+        cmsghdr* header = CMSG_FIRSTHDR(&message);
+        header->cmsg_level = SOL_SOCKET;
+        header->cmsg_type = SCM_RIGHTS;
+        header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
+        std::memcpy(CMSG_DATA(header), descriptors.data(), sizeof(int) * descriptors.size());
+      }
+      const ssize_t count = ::sendmsg(socket_.get(), &message, MSG_NOSIGNAL);
+      if (count <= 0) return false;
+      bytes.remove_prefix(static_cast<size_t>(count));
+      if (!descriptors.empty()) return bytes.empty() || send(bytes);
+    }
+    return true;
+  }
+  // What the writer makes of a call; the serial is the next one.
+  template <typename Body>
+  uint32_t call(std::string_view member, std::string_view signature, Body&& body, bool expectsReply = true,
+                const std::vector<int>& descriptors = {}) {
+    std::string bytes;
+    MessageWriter writer(bytes);
+    writer.beginCall(++serial_, {.member = member,
+                                 .signature = signature,
+                                 .expectsReply = expectsReply,
+                                 .unixFds = static_cast<uint32_t>(descriptors.size())});
+    body(writer);
+    EXPECT_TRUE(writer.end());
+    send(bytes, descriptors);
+    return serial_;
+  }
+  uint32_t call(std::string_view member, bool expectsReply = true) {
+    return call(
+        member, "", [](MessageWriter&) {}, expectsReply);
+  }
+  // The next message, or none at the stream's end. It is valid until the next call of this.
+  std::optional<Message> receive() {
+    received_.erase(0, std::exchange(lastSize_, 0));
+    while (true) {
+      Message message;
+      const Frame frame = readMessage(std::as_bytes(std::span(received_)), 1u << 26, message);
+      if (frame.status == FrameStatus::complete) {
+        lastSize_ = frame.size;
+        return message;
+      }
+      if (frame.status != FrameStatus::incomplete || !fill()) return std::nullopt;
+    }
+  }
+  // The string, or error name, of the next message.
+  std::string receiveText() {
+    const auto message = receive();
+    if (!message) return "(end)";
+    if (message->type == wire::MessageType::error) return std::string(message->errorName);
+    BodyReader reader(*message);
+    std::string_view text;
+    return reader.hasSignature("s") && reader.readStringView(text) ? std::string(text)
+                                                                   : std::string(message->signature);
+  }
+  // Nothing more comes: the server has closed.
+  bool atEnd() {
+    received_.erase(0, std::exchange(lastSize_, 0));
+    return received_.empty() && !fill();
+  }
+  [[nodiscard]] std::string& received() { return received_; }
+  bool fill() {
+    pollfd waiting{socket_.get(), POLLIN, 0};
+    if (::poll(&waiting, 1, 30000) <= 0) return false;
+    char buffer[65536];
+    const ssize_t count = ::recv(socket_.get(), buffer, sizeof buffer, 0);
+    if (count <= 0) return false;
+    received_.append(buffer, static_cast<size_t>(count));
+    return true;
+  }
+  void halfClose() { ::shutdown(socket_.get(), SHUT_WR); }
+  void close() { socket_ = Descriptor(); }
+
+ private:
+  Descriptor socket_;
+  bool connected_ = false;
+  uint32_t serial_ = 0;
+  std::string received_;
+  size_t lastSize_ = 0;
+};
+
+inline size_t openDescriptors() {
+  size_t count = 0;
+  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    (void)entry;
+    ++count;
+  }
+  return count;
+}
+
+}  // namespace kyt::test
