@@ -11,34 +11,14 @@
 #include <optional>
 #include <utility>
 
+#include "platform/Descriptor.h"
 #include "platform/Error.h"
 #include "platform/Function.h"
 #include "platform/Value.h"
 
 namespace kyt {
 
-// The descriptors that came with an upload: the open file and its folder. Move-only; closes at destruction.
-class Descriptor {
- public:
-  Descriptor() = default;
-  Descriptor(int fd, void (*closer)(int)) : fd_(fd), closer_(closer) {}
-  Descriptor(Descriptor&& other) noexcept : fd_(std::exchange(other.fd_, -1)), closer_(other.closer_) {}
-  Descriptor& operator=(Descriptor&& other) noexcept {
-    std::swap(fd_, other.fd_);
-    std::swap(closer_, other.closer_);
-    return *this;
-  }
-  ~Descriptor() {
-    if (fd_ >= 0 && closer_ != nullptr) closer_(fd_);
-  }
-  [[nodiscard]] int get() const { return fd_; }
-  [[nodiscard]] int release() { return std::exchange(fd_, -1); }
-
- private:
-  int fd_ = -1;
-  void (*closer_)(int) = nullptr;
-};
-
+// The descriptors that came with an upload: the open file and its folder.
 struct FileExtension {
   Descriptor file;    // opened for reading by the client
   Descriptor folder;  // its folder, opened with O_PATH
