@@ -6,6 +6,7 @@
 #include <linux/rtnetlink.h>
 #include <net/if.h>
 #include <netinet/in.h>
+#include <sys/ioctl.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -38,7 +39,7 @@ std::optional<int> usableInterface(const nlmsghdr* header) {
   const bool carries = route->rtm_type == RTN_UNICAST || route->rtm_type == RTN_LOCAL ||
                        route->rtm_type == RTN_ANYCAST || route->rtm_type == RTN_BROADCAST ||
                        route->rtm_type == RTN_MULTICAST;
-  if (!carries || (route->rtm_flags & (RTNH_F_DEAD | RTNH_F_LINKDOWN)) != 0) return std::nullopt;
+  if (!carries) return std::nullopt;
   int interface = 0;
   auto left = static_cast<unsigned>(RTM_PAYLOAD(header));
   for (const rtattr* attribute = RTM_RTA(route); RTA_OK(attribute, left);
@@ -76,6 +77,7 @@ RouteTable::RouteTable(std::vector<std::string> cellularInterfaces, std::string 
 
 RouteTable::~RouteTable() {
   if (socket_ >= 0) close(socket_);
+  if (flagsSocket_ >= 0) close(flagsSocket_);
 }
 
 std::optional<int> RouteTable::lookUp(const sockaddr& address, int through) {
@@ -119,13 +121,27 @@ std::optional<int> RouteTable::lookUp(const sockaddr& address, int through) {
   }
 }
 
+std::optional<int> RouteTable::usableRoute(const sockaddr& address, int through) {
+  const std::optional<int> interface = lookUp(address, through);
+  return interface && hasCarrier(*interface) ? interface : std::nullopt;
+}
+
+bool RouteTable::hasCarrier(int interface) {
+  if (flagsSocket_ < 0) flagsSocket_ = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  ifreq question{};
+  const std::string name = nameOf(interface);
+  name.copy(question.ifr_name, sizeof question.ifr_name - 1);
+  if (name.empty() || ioctl(flagsSocket_, SIOCGIFFLAGS, &question) != 0) return true;
+  return (question.ifr_flags & IFF_RUNNING) != 0;
+}
+
 bool RouteTable::isReachable(const sockaddr& address, bool avoidCellular) {
   if (avoidCellular) return interfaceAvoidingCellular(address).has_value();
-  return lookUp(address, 0).has_value();
+  return usableRoute(address, 0).has_value();
 }
 
 std::optional<std::string> RouteTable::interfaceAvoidingCellular(const sockaddr& address) {
-  const std::optional<int> preferred = lookUp(address, 0);
+  const std::optional<int> preferred = usableRoute(address, 0);
   if (!preferred) return std::nullopt;
   std::string name = nameOf(*preferred);
   if (!isCellular(name)) return name;
@@ -135,7 +151,7 @@ std::optional<std::string> RouteTable::interfaceAvoidingCellular(const sockaddr&
   for (const struct if_nameindex* one = all.get(); one->if_index != 0; ++one) {
     if (isCellular(one->if_name)) continue;
     const auto index = static_cast<int>(one->if_index);
-    if (lookUp(address, index).has_value()) return one->if_name;
+    if (usableRoute(address, index).has_value()) return one->if_name;
   }
   return std::nullopt;
 }
@@ -152,8 +168,8 @@ bool RouteTable::isCellular(const std::string& interface) const {
 
 bool RouteTable::hasDefaultRoute() {
   // Addresses that no network uses, so that only a default route leads to them.
-  return lookUp(generic(parseAddress(AF_INET, "192.0.2.1")), 0).has_value() ||
-         lookUp(generic(parseAddress(AF_INET6, "2001:db8::1")), 0).has_value();
+  return usableRoute(generic(parseAddress(AF_INET, "192.0.2.1")), 0).has_value() ||
+         usableRoute(generic(parseAddress(AF_INET6, "2001:db8::1")), 0).has_value();
 }
 
 bool RouteTable::canResolve() {
@@ -169,7 +185,7 @@ bool RouteTable::canResolve() {
     if (address.ss_family == AF_UNSPEC) continue;
     named = true;
     const bool local = text.starts_with("127.") || text == "::1";
-    if (local ? hasDefaultRoute() : lookUp(generic(address), 0).has_value()) return true;
+    if (local ? hasDefaultRoute() : usableRoute(generic(address), 0).has_value()) return true;
   }
   return !named && hasDefaultRoute();
 }

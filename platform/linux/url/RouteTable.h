@@ -38,14 +38,17 @@ class RouteTable {
   [[nodiscard]] bool isCellular(const std::string& interface) const;
 
  private:
-  // The outgoing interface's index of a usable route (0: unknown), or nothing. `through`: only this
+  // The outgoing interface's index of a route (0: unknown), or nothing. `through`: only this
   // interface; 0: any.
   [[nodiscard]] std::optional<int> lookUp(const sockaddr& address, int through);
+  // … of one whose cable is plugged in: the kernel keeps routes over links that lost their carrier.
+  [[nodiscard]] std::optional<int> usableRoute(const sockaddr& address, int through);
+  [[nodiscard]] bool hasCarrier(int interface);
   [[nodiscard]] bool hasDefaultRoute();
 
   std::vector<std::string> cellularInterfaces_;
   std::string sysClassNet_, resolverFile_;
-  int socket_ = -1;
+  int socket_ = -1, flagsSocket_ = -1;
   unsigned sequence_ = 0;
 };
 

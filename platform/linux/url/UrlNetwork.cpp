@@ -80,8 +80,14 @@ void URLNetwork::submit(Command command) {
     if (commands_.size() == 1) eventfd_write(wake_, 1);
     return;
   }
+  if (!startThread())
+    log_.error("CurlURLSession(start): cannot start the network thread, the request is delayed");
+}
+
+bool URLNetwork::startThread() {
   if (epoll_ < 0) epoll_ = epoll_create1(EPOLL_CLOEXEC);
   if (wake_ < 0) wake_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  if (epoll_ < 0 || wake_ < 0) return false;
   // The thread takes no signals: they are the main thread's business.
   sigset_t all, before;
   sigfillset(&all);
@@ -89,10 +95,10 @@ void URLNetwork::submit(Command command) {
   try {
     thread_ = std::thread([this] { run(); });
     running_ = true;
-  } catch (const std::system_error& error) {  // the next command tries again
-    log_.error("CurlURLSession(start): cannot start the network thread: %s", error.what());
+  } catch (const std::system_error&) {  // too many threads: the next command tries again
   }
   pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  return running_;
 }
 
 void URLNetwork::stop() {
@@ -227,6 +233,7 @@ void URLNetwork::activate(URLTransfer& transfer) {
   transfer.lastProgress = now_;
   const CURLcode code = pool->add(transfer);
   if (code != CURLE_OK) {
+    pool->closeIfIdle();
     fail(transfer, code, curl_easy_strerror(code));
     return;
   }

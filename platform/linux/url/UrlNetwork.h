@@ -71,6 +71,7 @@ class URLNetwork {
   };
 
   void submit(Command command);
+  [[nodiscard]] bool startThread() REQUIRES(mutex_);
   void run();
   void handleEvent(uint64_t which, uint32_t events);
   void takeCommands();
@@ -84,14 +85,15 @@ class URLNetwork {
   void cancelEverything();
 
   // Waiting for connectivity (UrlNetworkWaiting.cpp).
+  class Answers;
   [[nodiscard]] bool retryOrWait(URLTransfer& transfer, CURLcode code, long systemError);
-  [[nodiscard]] bool canLeave(URLTransfer& transfer);
+  [[nodiscard]] bool canLeave(const URLTransfer& transfer);
   void setAside(URLTransfer& transfer);
   void displaceOldest(URLSessionState& session);
   void stopWaiting(URLTransfer& transfer);
   void listenForRoutes();
   void routesChanged();
-  void retryWaiting(bool all);
+  void retryWaiting(bool evenIfNamesSeemUnknowable);
   void waitingTimer();
 
   // Constant.

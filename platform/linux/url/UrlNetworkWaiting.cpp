@@ -41,7 +41,7 @@ bool URLNetwork::retryOrWait(URLTransfer& transfer, CURLcode code, long systemEr
   return true;
 }
 
-bool URLNetwork::canLeave(URLTransfer& transfer) {
+bool URLNetwork::canLeave(const URLTransfer& transfer) {
   if (transfer.addresses.empty()) return routes_.canResolve();
   return std::any_of(transfer.addresses.begin(), transfer.addresses.end(),
                      [&](const sockaddr_storage& address) {
@@ -110,14 +110,48 @@ void URLNetwork::waitingTimer() {
   retryWaiting(true);
 }
 
-void URLNetwork::retryWaiting(bool all) {
+// What is asked about the same servers is asked once: thousands of sessions may wait for one.
+class URLNetwork::Answers {
+ public:
+  explicit Answers(URLNetwork& network) : network_(network) {}
+  bool canLeave(const URLTransfer& transfer) {
+    if (transfer.addresses.empty()) {
+      if (!std::exchange(namesAsked_, true)) namesCanBeKnown_ = network_.canLeave(transfer);
+      return namesCanBeKnown_;
+    }
+    const auto bytes = [](const URLTransfer& one) {
+      return std::string_view(reinterpret_cast<const char*>(one.addresses.data()),
+                              one.addresses.size() * sizeof one.addresses[0]);
+    };
+    const bool cellular = transfer.request.allowsCellularAccess;
+    for (const Known& known : known_)
+      if (known.cellular == cellular && known.addresses == bytes(transfer)) return known.canLeave;
+    const bool answer = network_.canLeave(transfer);
+    if (known_.size() < kMostKnown) known_.push_back({std::string(bytes(transfer)), cellular, answer});
+    return answer;
+  }
+
+ private:
+  static constexpr size_t kMostKnown = 16;
+  struct Known {
+    std::string addresses;
+    bool cellular, canLeave;
+  };
+  URLNetwork& network_;
+  bool namesAsked_ = false, namesCanBeKnown_ = false;
+  std::vector<Known> known_;
+};
+
+void URLNetwork::retryWaiting(bool evenIfNamesSeemUnknowable) {
+  Answers answers(*this);
   for (URLSessionState* session = sessions_.first(); session != nullptr;) {
     URLSessionState* nextSession = session->links.next;
     const std::shared_ptr<URLSessionState> kept =
         session->transfers.empty() ? nullptr : session->transfers.first()->session;
     for (URLTransfer* transfer = session->transfers.first(); transfer != nullptr;) {
       URLTransfer* next = transfer->links.next;
-      if (transfer->phase == URLTransfer::Phase::waiting && (all || canLeave(*transfer))) {
+      const bool unknown = evenIfNamesSeemUnknowable && transfer->addresses.empty();
+      if (transfer->phase == URLTransfer::Phase::waiting && (unknown || answers.canLeave(*transfer))) {
         withdraw(*transfer);
         transfer->immediateRetries = 0;
         activate(*transfer);

@@ -103,6 +103,18 @@ TEST_F(CurlURLSessionConnectivity, WaitsWhileTheLinkIsDown) {
   EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
 }
 
+TEST_F(CurlURLSessionConnectivity, WaitsWhileTheCableIsUnplugged) {
+  ASSERT_TRUE(restoreRoute());
+  ASSERT_TRUE(there_->run("ip link set eth8 down"));
+  auto urls = session(true);
+  Outcome outcome;
+  urls->start(get(server_->url("/")), outcome.completion());
+  ASSERT_TRUE(waitUntilWaiting(1));  // when nobody answered the question who has the gateway's address
+  ASSERT_TRUE(there_->run("ip link set eth8 up && ip route add default via 10.77.0.2"));
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+}
+
 TEST_F(CurlURLSessionConnectivity, FailsAtOnceInASessionThatDoesNotWait) {
   auto urls = session(false);
   EXPECT_EQ(perform(*urls, get(server_->url("/"))).errorCode(), CURLE_COULDNT_CONNECT);
@@ -199,6 +211,32 @@ TEST_F(CurlURLSessionConnectivity, WaitsWhileNoNameServerHasARoute) {
   EXPECT_EQ(outcome.errorCode(), CURLE_COULDNT_RESOLVE_HOST);
 }
 
+TEST_F(CurlURLSessionConnectivity, GivesUpALookUpOfANameAtOnce) {
+  std::string server;
+  std::ifstream file("/etc/resolv.conf");
+  for (std::string word; file >> word;)
+    if (word == "nameserver" && file >> server) break;
+  if (server.empty() || server.starts_with("127.") || server.find(':') != std::string::npos)
+    GTEST_SKIP() << "this machine's name server is not one that the test can make silent";
+  // The name server's address leads where nobody answers.
+  ASSERT_TRUE(here_->run("ip route add " + server + " via 10.77.0.1") &&
+              there_->run("ip route add blackhole " + server));
+  auto urls = session(true);
+  Outcome cancelled, late;
+  const auto before = std::chrono::steady_clock::now();
+  const auto task = urls->start(get("http://host.kyt.invalid/"), cancelled.completion());
+  URLRequest request = get("http://other.kyt.invalid/");
+  request.timeout = 300ms;
+  urls->start(std::move(request), late.completion());
+  ASSERT_TRUE(late.wait());
+  EXPECT_EQ(late.errorCode(), CURLE_OPERATION_TIMEDOUT);
+  EXPECT_FALSE(cancelled.isDone());
+  task->cancel();
+  ASSERT_TRUE(cancelled.wait());
+  factory_.reset();
+  EXPECT_LT(std::chrono::steady_clock::now() - before, 3s);  // the look-up itself takes five seconds and more
+}
+
 // A second way to the server, over an interface that counts as cellular.
 class CurlURLSessionCellular : public CurlURLSessionConnectivity {
  protected:
@@ -253,7 +291,8 @@ TEST_F(CurlURLSessionCellular, DoesNotFollowAnOpenConnectionOntoACellularRoute) 
   ASSERT_TRUE(here_->run("ip route add 10.78.0.0/24 via 10.77.0.1"));
   auto urls = session(true);
   EXPECT_EQ(perform(*urls, wifiOnly()).status(), 200);
-  // Now the route table leads over the cellular interface, and what leaves there is lost; the cable still carries.
+  // Now the route table leads over the cellular interface, and what leaves there is lost; the cable still
+  // carries.
   ASSERT_TRUE(here_->run("ip route del 10.78.0.0/24"));
   ASSERT_TRUE(there_->run("ip link set cell8 down"));
   URLRequest request = wifiOnly();

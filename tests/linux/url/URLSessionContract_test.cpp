@@ -1,0 +1,163 @@
+// What every implementation of the URL session port promises, tested on the real one and on the one in
+// memory.
+#include "platform/WorkerPool.h"
+#include "platform/fake/FakeUrlSession.h"
+#include "tests/linux/url/CurlUrlSessionFixture.h"
+
+namespace kyt {
+namespace {
+
+// One implementation with a server behind it that answers 200 and the request's body.
+class Implementation {
+ public:
+  virtual ~Implementation() = default;
+  virtual URLSessionFactory& factory() = 0;
+  virtual std::string url() = 0;
+  virtual void answerAll() = 0;  // from now on; until then requests stay open
+};
+
+class RealImplementation final : public Implementation {
+ public:
+  RealImplementation() {
+    server_.setHandler([](const TestHTTPServer::Request& request) {
+      return TestHTTPServer::Reply{.body = request.body, .behaviour = TestHTTPServer::Behaviour::hold};
+    });
+  }
+  URLSessionFactory& factory() override { return factory_; }
+  std::string url() override { return server_.url("/"); }
+  void answerAll() override { server_.release(); }
+
+ private:
+  TestHTTPServer server_;
+  MemoryLogSink sink_;
+  Log log_{sink_};
+  Counters counters_;
+  CurlURLSessionFactory factory_{{}, log_, counters_};
+};
+
+class FakeImplementation final : public Implementation {
+ public:
+  ~FakeImplementation() override { pool_.shutDown(); }
+  URLSessionFactory& factory() override { return factory_; }
+  std::string url() override { return "http://server.example/"; }
+  void answerAll() override {
+    factory_.setResponder([](const URLRequest& request) {
+      return FakeURLSessionFactory::Reply{.body = std::string(request.body.view())};
+    });
+    for (size_t i = 0; i < factory_.requestCount(); ++i)
+      factory_.complete(i, 200, {}, factory_.request(i).body.view());
+  }
+
+ private:
+  WorkerPool pool_{{}};
+  FakeURLSessionFactory factory_{&pool_};
+};
+
+template <typename T>
+class URLSessionContract : public testing::Test {
+ protected:
+  URLRequest request(std::string_view body = "body") {
+    URLRequest made;
+    made.method = "POST";
+    made.url = implementation_.url();
+    made.body = Data(body);
+    return made;
+  }
+  URLSessionFactory& factory() { return implementation_.factory(); }
+  bool drained() {
+    return eventually([&] { return factory().outstanding() == 0; });
+  }
+  T implementation_;
+};
+using Implementations = testing::Types<RealImplementation, FakeImplementation>;
+TYPED_TEST_SUITE(URLSessionContract, Implementations);
+
+TYPED_TEST(URLSessionContract, CompletesOnceOnAnotherThread) {
+  auto urls = this->factory().create({});
+  this->implementation_.answerAll();
+  Outcome outcome;
+  urls->start(this->request(), outcome.completion());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200);
+  EXPECT_EQ(outcome.body(), "body");
+  EXPECT_NE(outcome.thread(), std::this_thread::get_id());
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(outcome.calls(), 1);
+}
+
+TYPED_TEST(URLSessionContract, CountsWhatIsOutstanding) {
+  auto urls = this->factory().create({});
+  Outcome outcome;
+  urls->start(this->request(), outcome.completion());
+  urls->start(this->request(), nullptr);
+  EXPECT_EQ(this->factory().outstanding(), 2u);
+  this->implementation_.answerAll();
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(this->factory().figures().started, 2u);
+  EXPECT_EQ(this->factory().figures().completed, 2u);
+  EXPECT_EQ(this->factory().figures().failed, 0u);
+}
+
+TYPED_TEST(URLSessionContract, CompletesWhatWasStartedBeforeTheSessionIsGone) {
+  auto urls = this->factory().create({});
+  Outcome outcome;
+  urls->start(this->request(), outcome.completion());
+  urls.reset();
+  EXPECT_FALSE(outcome.isDone());
+  this->implementation_.answerAll();
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200);
+}
+
+TYPED_TEST(URLSessionContract, RefusesWhatIsStartedAfterInvalidation) {
+  auto urls = this->factory().create({});
+  urls->finishTasksAndInvalidate();
+  urls->finishTasksAndInvalidate();
+  Outcome outcome;
+  urls->start(this->request(), outcome.completion());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(outcome.error()->domain, kKYTURLErrorDomain);
+  EXPECT_FALSE(outcome.data());
+  EXPECT_FALSE(outcome.response());
+}
+
+TYPED_TEST(URLSessionContract, CancelsATask) {
+  auto urls = this->factory().create({});
+  Outcome outcome;
+  const auto task = urls->start(this->request(), outcome.completion());
+  task->cancel();
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  this->implementation_.answerAll();
+  task->cancel();
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(outcome.calls(), 1);
+}
+
+TYPED_TEST(URLSessionContract, CancelsAllForGood) {
+  auto urls = this->factory().create({});
+  Outcome before, after;
+  urls->start(this->request(), before.completion());
+  this->factory().cancelAll();
+  urls->start(this->request(), after.completion());
+  ASSERT_TRUE(before.wait() && after.wait());
+  EXPECT_EQ(before.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(after.errorCode(), kURLErrorCancelled);
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(this->factory().figures().failed, 2u);
+}
+
+TYPED_TEST(URLSessionContract, StartsARequestFromACompletion) {
+  this->implementation_.answerAll();
+  auto urls = this->factory().create({});
+  Outcome second;
+  urls->start(this->request("first"),
+              [&](auto, auto, auto) { urls->start(this->request("second"), second.completion()); });
+  ASSERT_TRUE(second.wait());
+  EXPECT_EQ(second.body(), "second");
+  EXPECT_TRUE(this->drained());
+}
+
+}  // namespace
+}  // namespace kyt
