@@ -18,6 +18,7 @@ struct DigestKey {
 struct Options {
   std::filesystem::path state;      // certificates, database, lock
   std::filesystem::path bags;       // storebag files; empty: none are served
+  std::filesystem::path signKey;    // a private key in PEM; empty: only signed storebags are served
   std::filesystem::path readyFile;  // empty: none is written
   std::string listen = "127.0.0.1";
   std::vector<std::string> hosts;  // names and addresses beyond those of loopback, for the certificate

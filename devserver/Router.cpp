@@ -80,14 +80,14 @@ Reply verdict(const Post& post, unsigned status) {
 }  // namespace
 
 Router::Router(const Options& options, Store& store, const PostChecker& checker, EventStream& stream,
-               Suspensions& suspensions)
+               Suspensions& suspensions, std::optional<BagSigner> signer)
     : options_(options),
       store_(store),
       checker_(checker),
       stream_(stream),
       suspensions_(suspensions),
       queries_(store, checker),
-      storebags_(options.bags, options.maxAge),
+      storebags_(options.bags, options.maxAge, std::move(signer)),
       pagePolicy_(policyOfPage()) {}
 
 uint64_t Router::bodyLimit(const Request& request) const {
@@ -182,7 +182,9 @@ Answer Router::answerStorebag(const Request& request) {
       fetch.path == "/storebags/tolvar/" + fetch.name || fetch.path == "/bags/tolvar/" + fetch.name;
   const std::optional<Storebag> bag = oneBelow ? storebags_.find(fetch.name) : std::nullopt;
   Reply reply = text(404, "no such storebag");
-  if (bag) {
+  if (bag && !bag->problem.empty()) {
+    reply = text(500, printable(bag->problem));
+  } else if (bag) {
     const bool unchanged = !bag->lastModified.empty() && fetch.ifModifiedSince == bag->lastModified;
     reply = {unchanged ? 304U : 200U, *bag->content, "application/xml", {}};
     if (!bag->lastModified.empty()) reply.headers.push_back({"Last-Modified", bag->lastModified});

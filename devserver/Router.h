@@ -19,7 +19,7 @@ namespace kyt::devserver {
 class Router final : public HttpHandler {
  public:
   Router(const Options& options, Store& store, const PostChecker& checker, EventStream& stream,
-         Suspensions& suspensions);
+         Suspensions& suspensions, std::optional<BagSigner> signer);
 
   [[nodiscard]] uint64_t bodyLimit(const Request& request) const override;
   [[nodiscard]] Answer answer(Request& request) override;

@@ -25,25 +25,51 @@ bool isName(std::string_view name) {
 
 }  // namespace
 
+std::optional<Storebags::Source> Storebags::sourceOf(const std::string& name) const {
+  constexpr std::pair<const char*, const char*> kSources[] = {
+      {".plist", nullptr}, {".bag.toml", "toml"}, {".bag.json", "json"}, {".bag.plist", "plist"}};
+  for (const auto& [extension, format] : kSources) {
+    if (format != nullptr && !signer_) break;
+    Source source;
+    source.path = folder_ / (name + extension);
+    source.format = format;
+    struct stat status {};
+    if (stat(source.path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) continue;
+    source.seconds = status.st_mtim.tv_sec;
+    source.version = {status.st_mtim.tv_sec, status.st_mtim.tv_nsec, status.st_ino, status.st_size};
+    return source;
+  }
+  return std::nullopt;
+}
+
+std::variant<std::string, SigningError> Storebags::documentOf(const Source& source) const {
+  std::optional<std::string> content = readFile(source.path, kMaxStorebag);
+  if (!content) return SigningError{"it can't be read"};
+  if (source.format == nullptr) return std::move(*content);
+  return signer_->sign(*content, source.format);
+}
+
 std::optional<Storebag> Storebags::find(const std::string& name) {
   if (folder_.empty() || !isName(name)) return std::nullopt;
-  const std::filesystem::path path = folder_ / (name + ".plist");
   MutexLock lock(mutex_);
-  struct stat status {};
-  if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return std::nullopt;
+  const std::optional<Source> source = sourceOf(name);
+  if (!source) return std::nullopt;
   Entry& entry = entries_[name];
-  const std::tuple<int64_t, int64_t, uint64_t, int64_t> version{status.st_mtim.tv_sec, status.st_mtim.tv_nsec,
-                                                                status.st_ino, status.st_size};
-  if (!entry.content || entry.version != version) {
-    std::optional<std::string> content = readFile(path, kMaxStorebag);
-    if (!content) return std::nullopt;
+  if (!entry.content || entry.version != source->version) {
+    auto document = documentOf(*source);
+    if (const auto* error = std::get_if<SigningError>(&document)) {
+      Storebag bad;
+      bad.problem = source->path.filename().string() + ": " + error->reason;
+      return bad;
+    }
+    auto content = std::make_shared<const std::string>(std::move(std::get<std::string>(document)));
     const bool sameSecond =
-        entry.content && *entry.content != *content && status.st_mtim.tv_sec <= entry.lastModified;
-    entry.lastModified = sameSecond ? entry.lastModified + 1 : status.st_mtim.tv_sec;
-    entry.version = version;
-    entry.content = std::make_shared<const std::string>(std::move(*content));
+        entry.content && *entry.content != *content && source->seconds <= entry.lastModified;
+    entry.lastModified = sameSecond ? entry.lastModified + 1 : source->seconds;
+    entry.version = source->version;
+    entry.content = std::move(content);
   }
-  Storebag bag{entry.content, httpDate(entry.lastModified), "max-age=" + std::to_string(maxAge_)};
+  Storebag bag{entry.content, httpDate(entry.lastModified), "max-age=" + std::to_string(maxAge_), {}};
   applyOverrides(name, bag);
   return bag;
 }

@@ -47,6 +47,7 @@ void describe(CLI::App& app, Options& options, std::vector<std::string>& digestK
   app.add_option("--state", options.state, "Folder of certificates and database; made when missing")
       ->required();
   app.add_option("--bags", options.bags, "Folder of signed storebags, NAME.plist");
+  app.add_option("--sign-key", options.signKey, "Private key (PEM) that signs unsigned bags, NAME.bag.toml");
   app.add_option("--https-port", options.httpsPort, "Port for devices; 0: any free one")
       ->capture_default_str();
   app.add_option("--http-port", options.httpPort, "Port of the page and the queries; 0: any free one")
@@ -108,6 +109,13 @@ int serve(const Options& options, const sigset_t& signals) {
   const auto identity = serverIdentity(options.state, hosts);
   if (const auto* wrong = std::get_if<std::string>(&identity)) return fail(*wrong);
 
+  std::optional<BagSigner> signer;
+  if (!options.signKey.empty()) {
+    const auto key = readFile(options.signKey, 64 * 1024);
+    if (!key) return fail("can't read " + options.signKey.string());
+    signer.emplace(*key);
+  }
+
   EventStream stream;
   Suspensions suspensions([&] { stream.heartbeat(); });
   const auto committed = [&](const Commit& commit) {
@@ -118,7 +126,7 @@ int serve(const Options& options, const sigset_t& signals) {
                                                    {options.keepPosts, options.keepBytes}, committed, error);
   if (!store) return fail(error);
   const PostChecker checker(options.digestKeys, options.maxInflatedBytes);
-  Router router(options, *store, checker, stream, suspensions);
+  Router router(options, *store, checker, stream, suspensions, signer);
   const auto https = HttpServer::start(options, options.httpsPort, &std::get<Identity>(identity), router,
                                        suspensions, error);
   const auto http =

@@ -1,5 +1,7 @@
 // Storebags as a device fetches them: conditional requests, lifetimes, changes.
 #include <gtest/gtest.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
 
 #include "tests/devserver/ServerProcess.h"
 
@@ -89,6 +91,57 @@ TEST_F(StorebagsTest, NothingBesideTheFolderIsServed) {
   Call call;
   call.method = "DELETE";
   EXPECT_EQ(server_->https("/bags/tolvar/cadmor", call).status, 405);
+}
+
+std::string elementAfter(const std::string& key, const std::string& plist) {
+  const size_t begin = plist.find("<string>", plist.find("<key>" + key + "</key>")) + 8;
+  return plist.substr(begin, plist.find("</string>", begin) - begin);
+}
+
+std::string fromBase64(std::string text) {
+  std::erase_if(text, [](unsigned char c) { return std::isspace(c) != 0; });
+  std::string bytes(text.size(), '\0');
+  const int size =
+      EVP_DecodeBlock(reinterpret_cast<unsigned char*>(bytes.data()),
+                      reinterpret_cast<const unsigned char*>(text.data()), static_cast<int>(text.size()));
+  const auto padding = std::count(text.begin(), text.end(), '=');
+  bytes.resize(size < 0 ? 0 : static_cast<size_t>(size - padding));
+  return bytes;
+}
+
+TEST(UnsignedStorebags, AreSignedWithTheKeyAndServed) {
+  TemporaryFolder state, bags;
+  const std::unique_ptr<EVP_PKEY, void (*)(EVP_PKEY*)> key(EVP_RSA_gen(2048), EVP_PKEY_free);
+  const std::string keyFile = bags.path() / "private.pem";
+  FILE* file = fopen(keyFile.c_str(), "w");
+  ASSERT_NE(file, nullptr);
+  PEM_write_PrivateKey(file, key.get(), nullptr, nullptr, 0, nullptr, nullptr);
+  fclose(file);
+  bags.write("cadmor.bag.toml", "version = '1'\n[release]\n");
+  ServerProcess server(state.path(), {"--bags", bags.path().string(), "--sign-key", keyFile});
+  ASSERT_TRUE(server.isReady());
+  const Response response = server.https("/bags/tolvar/cadmor");
+  ASSERT_EQ(response.status, 200) << response.body;
+  const std::string bag = fromBase64(elementAfter("bag", response.body));
+  const std::string signature = fromBase64(elementAfter("signature", response.body));
+  EXPECT_NE(bag.find("<key>release</key>"), std::string::npos) << bag;
+  const std::unique_ptr<EVP_MD_CTX, void (*)(EVP_MD_CTX*)> context(EVP_MD_CTX_new(), EVP_MD_CTX_free);
+  ASSERT_EQ(EVP_DigestVerifyInit(context.get(), nullptr, EVP_sha1(), nullptr, key.get()), 1);
+  EXPECT_EQ(
+      EVP_DigestVerify(context.get(), reinterpret_cast<const unsigned char*>(signature.data()),
+                       signature.size(), reinterpret_cast<const unsigned char*>(bag.data()), bag.size()),
+      1);
+  bags.write("cadmor.bag.toml", "version = ");
+  EXPECT_EQ(server.https("/bags/tolvar/cadmor").status, 500);
+  EXPECT_TRUE(server.https("/bags/tolvar/cadmor").body.starts_with("cadmor.bag.toml: "));
+  bags.write("cadmor.plist", "signed already");
+  EXPECT_EQ(server.https("/bags/tolvar/cadmor").body, "signed already");
+}
+
+TEST_F(StorebagsTest, WithoutAKeyUnsignedBagsAreNotServed) {
+  bags_.write("other.bag.toml", "version = '1'\n");
+  EXPECT_EQ(fetch("/bags/tolvar/other").status, 404);
+  EXPECT_EQ(fetch("/bags/tolvar/other.bag").status, 404);
 }
 
 TEST_F(StorebagsTest, FetchesAreLogged) {
