@@ -17,12 +17,12 @@ Dictionary client(const std::string& name, const std::string& base) {
           {"realtime_post_url", base + "/events/" + name + "/realtime"}};
 }
 
-std::string script(const std::string& name, int sessionID) {
+std::string script(const std::string& name, int sessionID, int clientType) {
   const std::string user = "{\"ClientName\":\"" + name + "\",\"ServiceName\":\"demo\"}";
   std::string text =
       "{\"do\":\"open\",\"sessionInfo\":{\"SessionID\":" + std::to_string(sessionID) +
-      ",\"ClientType\":20,\"ClientVersion\":3,\"BatchEvent\":true,\"RequireUserInfo\":true},\"userInfo\":" +
-      user + "}\n";
+      ",\"ClientType\":" + std::to_string(clientType) +
+      ",\"ClientVersion\":3,\"BatchEvent\":true,\"RequireUserInfo\":true},\"userInfo\":" + user + "}\n";
   text += "{\"do\":\"configure\"}\n";
   text += std::string("{\"do\":\"digestKey\",\"hex\":\"") + kDemoDigestKeyHex + "\",\"algorithm\":0}\n";
   text += "{\"do\":\"displayURL\"}\n";
@@ -41,21 +41,18 @@ std::string script(const std::string& name, int sessionID) {
 
 }  // namespace
 
-Dictionary demoBag(const std::string& serverBase) {
-  const Dictionary section = {
-      {"qrs",
-       Dictionary{{"display_url", serverBase + "/"}, {"clients", Array{client("kytdemo", serverBase)}}}},
-      {"httppost", Dictionary{{"display_url", serverBase + "/"},
-                              {"clients", Array{client("kytdemo-plain", serverBase)}}}}};
+Dictionary demoBag(const std::string& serverBase, const std::string& backend, const std::string& clientName) {
+  const Dictionary section = {{backend, Dictionary{{"display_url", serverBase + "/"},
+                                                   {"clients", Array{client(clientName, serverBase)}}}}};
   return {{"version", "demo-1"}, {"refresh_cycle", 3600}, {"release", section}, {"vantu_internal", section}};
 }
 
 std::string signedClientScript() {
-  return script("kytdemo", 7001);
+  return script("kytdemo", 7001, 20);
 }
 
 std::string plainClientScript() {
-  return script("kytdemo-plain", 7002);
+  return script("kytdemo-plain", 7002, 8);
 }
 
 }  // namespace kyt::tools

@@ -13,9 +13,10 @@ inline constexpr int kDemoEvents = 20;
 inline constexpr char kDemoDigestKeyHex[] = "6b79742d64656d6f2d646967657374";
 inline constexpr char kDemoAccount[] = "owner@example.org";
 
-// For client types 7, 11, 13 and 20 ("cadmor"): the clients "kytdemo" (back end "qrs", posts signed with the
-// digest key) and "kytdemo-plain" (back end "httppost").
-[[nodiscard]] Dictionary demoBag(const std::string& serverBase);
+// A storebag with one back end and one client: "kytdemo" reports through "qrs" (posts signed with the digest
+// key) as client type 20 ("cadmor"), "kytdemo-plain" through "httppost" as client type 8 ("dulvek").
+[[nodiscard]] Dictionary demoBag(const std::string& serverBase, const std::string& backend,
+                                 const std::string& clientName);
 
 // Sessions in kytctl's script form.
 [[nodiscard]] std::string signedClientScript();

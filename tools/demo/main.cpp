@@ -47,7 +47,9 @@ void waitForInterrupt() {
 }
 
 int demonstrate(Stage& stage, bool once) {
-  if (auto error = stage.putStorebag("cadmor", demoBag(stage.httpsBase())))
+  if (auto error = stage.putStorebag("cadmor", demoBag(stage.httpsBase(), "qrs", "kytdemo")))
+    return complain(error->localizedDescription);
+  if (auto error = stage.putStorebag("dulvek", demoBag(stage.httpsBase(), "httppost", "kytdemo-plain")))
     return complain(error->localizedDescription);
   if (auto error = stage.startDaemon()) return complain(error->localizedDescription);
   std::printf("daemon    socket %s, log %s\nserver    %s, page %s/\n", stage.socketPath().c_str(),
