@@ -20,10 +20,6 @@ class Queries {
   [[nodiscard]] int64_t countEvents(const Request& request);
   [[nodiscard]] static bool hasFilters(const Request& request);
 
-  [[nodiscard]] static std::string totalsAsJson(const Totals& totals);
-  // What pages are told about a transaction: its posts, fetches and the last of its events.
-  [[nodiscard]] static std::string commitAsJson(const Commit& commit);
-
  private:
   [[nodiscard]] Reply posts(const Request& request);
   [[nodiscard]] Reply post(int64_t id);

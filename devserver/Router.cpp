@@ -6,6 +6,7 @@
 
 #include "devserver/JsonText.h"
 #include "devserver/Page.h"
+#include "devserver/Rows.h"
 #include "devserver/Text.h"
 
 namespace kyt::devserver {
@@ -264,7 +265,7 @@ Answer Router::answerWait(const Request& request) {
     if (!reached && !expired) return std::nullopt;
     JsonText out;
     out.object().member("reached", reached).member("events", fitting);
-    out.key("totals").json(Queries::totalsAsJson(totals)).endObject();
+    out.key("totals").json(totalsAsJson(totals)).endObject();
     return Reply{200, out.text(), "application/json", {{"Cache-Control", "no-store"}}};
   };
   const auto seconds = std::chrono::seconds(std::min(timeout, kMaxWaitSeconds));

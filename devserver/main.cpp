@@ -19,6 +19,7 @@
 #include "devserver/JsonText.h"
 #include "devserver/Options.h"
 #include "devserver/Router.h"
+#include "devserver/Rows.h"
 
 namespace kyt::devserver {
 namespace {
@@ -119,7 +120,7 @@ int serve(const Options& options, const sigset_t& signals) {
   EventStream stream;
   Suspensions suspensions([&] { stream.heartbeat(); });
   const auto committed = [&](const Commit& commit) {
-    if (stream.hasListeners()) stream.publish("commit", Queries::commitAsJson(commit));
+    if (stream.hasListeners()) stream.publish("commit", commitAsJson(commit));
     suspensions.wake(WaitFor::data);
   };
   const std::unique_ptr<Store> store = Store::open(options.state / "devserver.sqlite",

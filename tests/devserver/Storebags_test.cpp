@@ -3,6 +3,9 @@
 #include <openssl/evp.h>
 #include <openssl/pem.h>
 
+#include <algorithm>
+#include <cctype>
+
 #include "tests/devserver/ServerProcess.h"
 
 namespace kyt::devserver::test {
