@@ -1,0 +1,128 @@
+// The HTTPS back end's share of the road of one event: from the envelope into the batch, and from a batch of
+// 50 to the request. The reference of the second is the same work without the back end: the writer and zlib
+// alone, over the same records. Fakes stand in for the clock, the user defaults and the poster.
+#include <benchmark/benchmark.h>
+#include <zlib.h>
+
+#include "backends/https/HTTPSPostBackend.h"
+#include "bench/Corpus.h"
+#include "platform/Keys.h"
+#include "platform/SerialQueue.h"
+#include "tests/support/TestPlatform.h"
+
+namespace kyt {
+namespace {
+
+constexpr int kBatch = 50;
+
+class CountingPoster final : public ReportingSessionConnectivityInterface {
+ public:
+  void postURLRequestWithCompletionHandler(URLRequest request, URLCompletion) override {
+    bytes += request.body.size();
+    ++requests;
+  }
+  size_t bytes = 0, requests = 0;
+};
+
+// A session that requires user information, without consent, ten filters, as the daemon's own benchmark has
+// it.
+struct Stage {
+  Stage() {
+    platform.log.setLevel(LogLevel::error);
+    platform.deviceProperties.setCountryCode("US");
+    Array filters;
+    for (int i = 0; i < 10; ++i)
+      filters.append(Value(Dictionary{{"key", "filteredKey" + std::to_string(i)}, {"action", "remove"}}));
+    const Dictionary entry{{"override_dnu", 1},          {"locale_whitelist", Array{"US"}},
+                           {"filters", filters},         {"sampling_threshold", 1.0},
+                           {"event_threshold", 1 << 30}, {"post_url", "https://post.example.org/"}};
+    backend = HTTPSPostBackend::initWithName(platform.configuration, String(kKYTReportingBackendHTTPPost),
+                                             Dictionary{{"clients", Array{entry}}}, String("Phone"));
+    backend->setCompType(6);
+    backend->setProductVersion(String("17.4.1"));
+    backend->setBuildVersion(String("21E236"));
+    backend->setHardwareType(String("Model14,2"));
+    backend->setRequireUserInfo(true);
+    backend->setBatchEvents(true);
+    backend->setUserInfoDict(Dictionary{{kKYTReportingUserInfoClientName, "a"}});
+    backend->setReportingSessionConnectivityDelegate(poster);
+    backend->updateState();
+    for (Dictionary& payload : bench::corpusPayloads(512))
+      envelopes.push_back({{kKYTReportingMessageBlobClientData, std::move(payload)}});
+  }
+  void send(size_t i) {
+    backend->sendMessage(envelopes[i % envelopes.size()], TimeValue{1769860800, 250000}, 5, 2,
+                         MessageFlag{0});
+  }
+
+  TestPlatform platform;
+  std::shared_ptr<CountingPoster> poster = std::make_shared<CountingPoster>();
+  std::shared_ptr<HTTPSPostBackend> backend;
+  std::vector<Dictionary> envelopes;
+};
+
+void envelopeToBatch(benchmark::State& state) {
+  Stage stage;
+  size_t i = 0;
+  for (auto _ : state) {
+    Turn turn;
+    for (int n = 0; n < kBatch; ++n) stage.send(i++);
+    state.PauseTiming();
+    stage.backend->setState(kBackendStateHeld);
+    stage.backend->flushMessagesWithCompletion(nullptr);  // gives the batch up
+    stage.backend->setState(kBackendStateEnabled);
+    state.ResumeTiming();
+  }
+  state.SetItemsProcessed(state.iterations() * kBatch);
+}
+BENCHMARK(envelopeToBatch);
+
+void batchToRequest(benchmark::State& state) {
+  Stage stage;
+  size_t i = 0;
+  for (auto _ : state) {
+    state.PauseTiming();
+    for (int n = 0; n < kBatch; ++n) stage.send(i++);
+    stage.platform.executor.runAll();
+    state.ResumeTiming();
+    stage.backend->flushMessagesWithCompletion(nullptr);
+  }
+  state.SetItemsProcessed(state.iterations() * kBatch);
+  state.counters["bytesPerRequest"] =
+      static_cast<double>(stage.poster->bytes) / static_cast<double>(stage.poster->requests);
+}
+BENCHMARK(batchToRequest);
+
+void referenceWriterAndDeflate(benchmark::State& state) {
+  Stage stage;
+  Array records;
+  for (size_t i = 0; i < kBatch; ++i) {
+    Dictionary record = stage.backend->newEventDictfromPayload(
+        *stage.envelopes[i].find(kKYTReportingMessageBlobClientData)->dictionary(), {1769860800, 250000}, 5,
+        2, EventID{});
+    stage.backend->prepareEventForMessage(record, nullptr);
+    records.append(Value(std::move(record)));
+  }
+  const Value message(records);
+  std::string json;
+  std::string out(1 << 20, '\0');
+  for (auto _ : state) {
+    json.clear();
+    stage.platform.json.writeCompact(message, json);
+    z_stream stream{};
+    if (deflateInit2(&stream, -1, 8, 31, 8, 0) != Z_OK) return state.SkipWithError("deflateInit2");
+    stream.next_in = reinterpret_cast<Bytef*>(json.data());
+    stream.avail_in = static_cast<uInt>(json.size());
+    stream.next_out = reinterpret_cast<Bytef*>(out.data());
+    stream.avail_out = static_cast<uInt>(out.size());
+    benchmark::DoNotOptimize(deflate(&stream, Z_FINISH));
+    state.counters["bytesPerRequest"] = static_cast<double>(stream.total_out);
+    deflateEnd(&stream);
+  }
+  state.SetItemsProcessed(state.iterations() * kBatch);
+  state.counters["jsonBytes"] = static_cast<double>(json.size());
+}
+BENCHMARK(referenceWriterAndDeflate);
+
+}  // namespace
+}  // namespace kyt
