@@ -4,21 +4,32 @@
 
 #include <algorithm>
 #include <climits>
+#include <cstddef>
+#include <cstdlib>
+#include <functional>
+#include <new>
 
 namespace kyt {
 namespace {
 
 class ZlibStream : public DeflateStream {
  public:
-  ZlibStream() = default;
+  explicit ZlibStream(ZlibDeflate& owner) : owner_(owner) {
+    stream_.zalloc = allocate;
+    stream_.zfree = release;
+    stream_.opaque = this;
+  }
   ZlibStream(const ZlibStream&) = delete;
   ZlibStream& operator=(const ZlibStream&) = delete;
   ~ZlibStream() override { end(); }
 
   int initialize(int level, int windowBits, int memoryLevel) override {
     end();
+    workspace_ = owner_.takeWorkspace();
+    used_ = 0;
     const int result = deflateInit2(&stream_, level, Z_DEFLATED, windowBits, memoryLevel, Z_DEFAULT_STRATEGY);
     initialized_ = result == Z_OK;
+    if (!initialized_) owner_.giveBack(std::move(workspace_));
     return result;
   }
 
@@ -43,13 +54,39 @@ class ZlibStream : public DeflateStream {
   }
 
   void end() override {
-    if (initialized_) deflateEnd(&stream_);
+    if (!initialized_) return;
+    deflateEnd(&stream_);
+    owner_.giveBack(std::move(workspace_));
     initialized_ = false;
   }
 
   [[nodiscard]] const char* message() const override { return stream_.msg; }
 
  private:
+  // zlib allocates all it needs in deflateInit2: from the workspace, one piece after the other, or from the
+  // heap what does not fit (larger settings than the usual).
+  static void* allocate(void* opaque, uInt items, uInt size) {
+    auto& self = *static_cast<ZlibStream*>(opaque);
+    constexpr size_t kAlignment = alignof(std::max_align_t);
+    const size_t bytes = (size_t{items} * size + kAlignment - 1) / kAlignment * kAlignment;
+    if (self.workspace_ == nullptr || bytes > ZlibDeflate::kWorkspaceBytes - self.used_)
+      return std::malloc(bytes);
+    void* piece = self.workspace_.get() + self.used_;
+    self.used_ += bytes;
+    return piece;
+  }
+  static void release(void* opaque, void* piece) {
+    const std::byte* begin = static_cast<ZlibStream*>(opaque)->workspace_.get();
+    const auto* place = static_cast<const std::byte*>(piece);
+    const std::less<> before;  // a total order, also between unrelated blocks
+    const bool inside =
+        begin != nullptr && !before(place, begin) && before(place, begin + ZlibDeflate::kWorkspaceBytes);
+    if (!inside) std::free(piece);
+  }
+
+  ZlibDeflate& owner_;
+  ZlibDeflate::Workspace workspace_;
+  size_t used_ = 0;  // of the workspace
   z_stream stream_{};
   bool initialized_ = false;
 };
@@ -57,7 +94,30 @@ class ZlibStream : public DeflateStream {
 }  // namespace
 
 std::unique_ptr<DeflateStream> ZlibDeflate::newStream() {
-  return std::make_unique<ZlibStream>();
+  return std::make_unique<ZlibStream>(*this);
+}
+
+ZlibDeflate::Workspace ZlibDeflate::takeWorkspace() {
+  {
+    MutexLock lock(mutex_);
+    if (!workspaces_.empty()) {
+      Workspace workspace = std::move(workspaces_.back());
+      workspaces_.pop_back();
+      return workspace;
+    }
+  }
+  return Workspace(new (std::nothrow) std::byte[kWorkspaceBytes]);
+}
+
+void ZlibDeflate::giveBack(Workspace workspace) {
+  if (workspace == nullptr) return;
+  MutexLock lock(mutex_);
+  if (workspaces_.size() < kMostKept) workspaces_.push_back(std::move(workspace));
+}
+
+size_t ZlibDeflate::kept() const {
+  MutexLock lock(mutex_);
+  return workspaces_.size();
 }
 
 }  // namespace kyt

@@ -121,5 +121,56 @@ TEST(FaultyDeflate, CopiesWithoutARealOneBehindIt) {
   EXPECT_EQ(target[1], std::byte{2});
 }
 
+// Compresses `source` with a new stream and returns what came out, decompressed.
+std::string roundTrip(ZlibDeflate& deflate, const std::string& source, int level = -1, int memoryLevel = 8) {
+  const auto stream = deflate.newStream();
+  EXPECT_EQ(stream->initialize(level, kGzip, memoryLevel), Z_OK);
+  std::vector<std::byte> target(stream->bound(source.size()));
+  std::span<const std::byte> input = std::as_bytes(std::span(source));
+  std::span<std::byte> output(target);
+  EXPECT_EQ(stream->finish(input, output), Z_STREAM_END);
+  target.resize(target.size() - output.size());
+  return inflated(target);
+}
+
+TEST(ZlibDeflate, UsesTheWorkspaceOfAnEndedStreamAgain) {
+  ZlibDeflate deflate;
+  EXPECT_EQ(deflate.kept(), 0u);
+  const std::string first = text();
+  EXPECT_EQ(roundTrip(deflate, first), first);
+  EXPECT_EQ(deflate.kept(), 1u);
+  const std::string second(50000, 'x');  // another text, over what the first left behind
+  EXPECT_EQ(roundTrip(deflate, second), second);
+  EXPECT_EQ(roundTrip(deflate, first), first);
+  EXPECT_EQ(deflate.kept(), 1u);
+}
+
+TEST(ZlibDeflate, KeepsFewWorkspaces) {
+  ZlibDeflate deflate;
+  std::vector<std::unique_ptr<DeflateStream>> streams;
+  for (size_t i = 0; i < 2 * ZlibDeflate::kMostKept; ++i) {
+    streams.push_back(deflate.newStream());
+    ASSERT_EQ(streams.back()->initialize(-1, kGzip, 8), Z_OK);
+  }
+  streams.clear();
+  EXPECT_EQ(deflate.kept(), ZlibDeflate::kMostKept);
+}
+
+TEST(ZlibDeflate, TakesFromTheHeapWhatALargerSettingNeeds) {
+  ZlibDeflate deflate;
+  const std::string source = text();
+  EXPECT_EQ(roundTrip(deflate, source, 9, 9), source);
+  EXPECT_EQ(roundTrip(deflate, source), source);
+}
+
+TEST(ZlibDeflate, GivesTheWorkspaceBackWhenItsSettingsAreRefused) {
+  ZlibDeflate deflate;
+  const auto stream = deflate.newStream();
+  EXPECT_EQ(stream->initialize(77, kGzip, 8), Z_STREAM_ERROR);
+  EXPECT_EQ(deflate.kept(), 1u);
+  EXPECT_EQ(stream->initialize(-1, kGzip, 8), Z_OK);
+  EXPECT_EQ(deflate.kept(), 0u);
+}
+
 }  // namespace
 }  // namespace kyt
