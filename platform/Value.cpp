@@ -243,6 +243,17 @@ void Dictionary::appendSlowly(String key, Value value) {
   ++block->size;
 }
 
+Dictionary Dictionary::takingOver(DictionaryEntry* entries, size_t count) {
+  assert(count <= detail::kMaxScanned);
+  Dictionary taken;
+  if (count == 0) return taken;
+  DictionaryBlock* block = detail::newDictionaryBlock(count);
+  detail::moveBytes(block->entries(), entries, count);
+  block->size = static_cast<uint32_t>(count);
+  taken.block_ = block;
+  return taken;
+}
+
 bool Dictionary::remove(std::string_view key) {
   const Value* found = find(key);
   if (found == nullptr) return false;

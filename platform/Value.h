@@ -217,6 +217,9 @@ class KYT_OBJECT Dictionary {
   void set(String key, Value value);
   // For decoders and record builders that know the key is new: no look-up. Precondition: !contains(key).
   void append(String key, Value value);
+  // For decoders: a dictionary of exactly `count` entries with different keys, at most 32. They are moved out of raw
+  // storage bit by bit, so the caller must not destroy them.
+  static Dictionary takingOver(DictionaryEntry* entries, size_t count);
   bool remove(std::string_view key);    // whether it was there
   void merge(const Dictionary& other);  // set() of each entry of other, in its order
   // Entries whose predicate (const String& key, Value& value) -> bool answers true are removed; the value may

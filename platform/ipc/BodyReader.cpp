@@ -2,6 +2,8 @@
 
 #include <bit>
 #include <cstring>
+#include <memory>
+#include <new>
 #include <utility>
 
 #include "platform/Limits.h"
@@ -14,6 +16,10 @@ namespace kyt {
 namespace {
 
 using Cursor = WireCursor;
+
+// On the road of every event: a call each for the few instructions of an aligned number would cost more than
+// they do.
+#define KYT_HOT [[gnu::always_inline]] inline
 
 [[gnu::cold, gnu::noinline]] bool stop(Cursor& c, BodyStatus status, const char* problem) {
   if (c.status == BodyStatus::ok) {
@@ -34,7 +40,7 @@ size_t left(const Cursor& c) {
 }
 
 template <size_t kAlignment>
-bool align(Cursor& c) {
+KYT_HOT bool align(Cursor& c) {
   const size_t padding = static_cast<size_t>(c.begin - c.at) & (kAlignment - 1);
   if (padding == 0) return true;
   if (padding > left(c)) [[unlikely]]
@@ -58,14 +64,14 @@ uint64_t swap(uint64_t v) {
 }
 
 template <typename T>
-T load(const uint8_t* at, bool swapped) {
+KYT_HOT T load(const uint8_t* at, bool swapped) {
   T value;
   std::memcpy(&value, at, sizeof value);
   return swapped ? swap(value) : value;
 }
 
 template <typename T>
-bool number(Cursor& c, T& out) {
+KYT_HOT bool number(Cursor& c, T& out) {
   if (!align<sizeof(T)>(c)) return false;
   if (left(c) < sizeof(T)) [[unlikely]]
     return malformed(c, "a value is cut off");
@@ -74,7 +80,7 @@ bool number(Cursor& c, T& out) {
   return true;
 }
 
-bool boolean(Cursor& c, bool& out) {
+KYT_HOT bool boolean(Cursor& c, bool& out) {
   uint32_t value = 0;
   if (!number(c, value)) return false;
   if (value > 1) return malformed(c, "a boolean is neither 0 nor 1");
@@ -82,7 +88,7 @@ bool boolean(Cursor& c, bool& out) {
   return true;
 }
 
-bool text(Cursor& c, std::string_view& out) {
+KYT_HOT bool text(Cursor& c, std::string_view& out) {
   uint32_t length = 0;
   if (!number(c, length)) return false;
   if (left(c) <= length) [[unlikely]]
@@ -98,7 +104,7 @@ bool text(Cursor& c, std::string_view& out) {
 }
 
 // The text of a signature, whose contents are not checked yet.
-bool signature(Cursor& c, std::string_view& out) {
+KYT_HOT bool signature(Cursor& c, std::string_view& out) {
   if (left(c) < 2) [[unlikely]]
     return malformed(c, "a signature is cut off");
   const size_t length = c.at[0];
@@ -113,7 +119,7 @@ bool signature(Cursor& c, std::string_view& out) {
 
 // Enters an array: `end` is where its elements stop.
 template <size_t kElementAlignment>
-bool array(Cursor& c, const uint8_t*& end) {
+KYT_HOT bool array(Cursor& c, const uint8_t*& end) {
   uint32_t length = 0;
   if (!number(c, length)) return false;
   if (length > wire::kMaxArrayBytes) return malformed(c, "an array is longer than 64 MiB");
@@ -144,145 +150,103 @@ bool isObjectType(std::string_view type) {
   }
 }
 
-// How many entries a dictionary's bytes hold, and whether a key comes twice, found in one quick look ahead
-// that checks nothing but the bounds, so that decoding can reserve exactly and append without looking up.
-// `count` is 0 where the look ahead did not see through the values: then decoding looks each key up.
-class EntryScan {
+// Gathers a dictionary's first entries in place, so that the dictionary is made once, in a block of exactly
+// its size. A repeated key is found by comparing with the others, which is done only when its bit in a small
+// filter is taken.
+class EntryGatherer {
  public:
-  EntryScan(const Cursor& c, const uint8_t* end, char valueType)
-      : begin_(c.begin),
-        at_(static_cast<size_t>(c.at - c.begin)),
-        end_(static_cast<size_t>(end - c.begin)),
-        swapped_(c.swapped) {
-    count_ = scan(valueType);
+  static constexpr size_t kMost = 32;
+  EntryGatherer() = default;
+  EntryGatherer(const EntryGatherer&) = delete;
+  EntryGatherer& operator=(const EntryGatherer&) = delete;
+  ~EntryGatherer() { std::destroy_n(entries(), count_); }
+
+  [[nodiscard]] bool full() const { return count_ == kMost; }
+  // Where the next entry is to be made, before gathered().
+  [[nodiscard]] void* next() { return entries() + count_; }
+  void gathered() {
+    DictionaryEntry& entry = entries()[count_++];
+    const uint64_t bit = uint64_t{1} << hash(entry.key);
+    if ((seen_ & bit) != 0) [[unlikely]]
+      mergeLast();
+    seen_ |= bit;
   }
-  [[nodiscard]] size_t count() const { return count_; }
+  // All of them; afterwards there are none.
+  [[nodiscard]] Dictionary take() { return Dictionary::takingOver(entries(), std::exchange(count_, 0)); }
 
  private:
-  static constexpr size_t kMaxEntries = 32;
+  DictionaryEntry* entries() { return std::launder(reinterpret_cast<DictionaryEntry*>(storage_)); }
 
-  size_t scan(char valueType) {
-    size_t count = 0;
-    uint64_t seen = 0;
-    while (at_ < end_) {
-      at_ = (at_ + 7) & ~size_t{7};
-      if (count == kMaxEntries || !fits(5)) return 0;
-      const size_t keyLength = load<uint32_t>(begin_ + at_, swapped_);
-      const size_t keyAt = at_ + 4;
-      at_ = keyAt;
-      if (!fits(keyLength + 2)) return 0;
-      const uint32_t print = fingerprint(begin_ + keyAt, keyLength);
-      const uint64_t bit = uint64_t{1} << (print >> 26);
-      if ((seen & bit) != 0 && isRepeated(print, keyAt, count)) return 0;
-      seen |= bit;
-      prints_[count] = print;
-      keys_[count] = static_cast<uint32_t>(keyAt);
-      ++count;
-      at_ += keyLength + 1;
-      if (!(valueType == 'v' ? skipVariant() : skip(&valueType, 1))) return 0;
-    }
-    return at_ == end_ ? count : 0;
-  }
-
-  [[nodiscard]] bool fits(size_t bytes) const { return at_ <= end_ && bytes <= end_ - at_; }
-
-  static uint32_t fingerprint(const uint8_t* key, size_t length) {
-    uint32_t head = 0, tail = 0;
-    if (length >= 4) {
-      std::memcpy(&head, key, 4);
-      std::memcpy(&tail, key + length - 4, 4);
+  // Six bits.
+  static unsigned hash(const String& key) {
+    uint64_t low = 0, high = 0;
+    const std::string_view text = key.view();
+    if (text.size() >= 8) {
+      std::memcpy(&low, text.data(), 8);
+      std::memcpy(&high, text.data() + text.size() - 8, 8);
     } else {
-      for (size_t i = 0; i < length; ++i) head = head << 8 | key[i];
+      std::memcpy(&low, &key, 8);  // short text lives in the first bytes of the string itself
     }
-    return (head * 0x9E3779B1u) ^ ((tail + static_cast<uint32_t>(length)) * 0x85EBCA77u);
+    return static_cast<unsigned>(((low ^ (high * 0x9E3779B97F4A7C15u)) * 0xD6E8FEB86659FD93u) >> 58);
   }
 
-  bool isRepeated(uint32_t print, size_t keyAt, size_t count) const {
-    const auto view = [this](size_t at) {
-      return std::string_view(reinterpret_cast<const char*>(begin_ + at),
-                              load<uint32_t>(begin_ + at - 4, swapped_));
-    };
-    for (size_t i = 0; i < count; ++i) {
-      if (prints_[i] == print && view(keys_[i]) == view(keyAt)) return true;
-    }
-    return false;
-  }
-
-  bool skipVariant() {
-    if (!fits(3)) return false;
-    const size_t length = begin_[at_];
-    const auto* type = reinterpret_cast<const char*>(begin_ + at_ + 1);
-    at_ += 1;
-    if (length == 0 || !fits(length + 1)) return false;
-    at_ += length + 1;
-    return skip(type, length);
-  }
-
-  bool skip(const char* type, size_t length) {
-    switch (type[0]) {
-      case 'y':
-        ++at_;
-        return true;
-      case 'n':
-      case 'q':
-        return skipFixed(2);
-      case 'b':
-      case 'i':
-      case 'u':
-        return skipFixed(4);
-      case 'x':
-      case 't':
-      case 'd':
-        return skipFixed(8);
-      case 's':
-      case 'o':
-        return skipSized(4, 1, 1);
-      case '(':
-        return length == 3 && skipFixed(8);
-      case 'a':
-        return length >= 2 && skipSized(4, wire::alignmentOf(type[1]), 0);
-      default:
-        return false;
+  void mergeLast() {
+    DictionaryEntry& last = entries()[count_ - 1];
+    for (size_t i = 0; i + 1 < count_; ++i) {
+      if (entries()[i].key == last.key) {
+        entries()[i].value = std::move(last.value);
+        std::destroy_at(&last);
+        --count_;
+        return;
+      }
     }
   }
-  bool skipFixed(size_t size) {
-    at_ = ((at_ + size - 1) & ~(size - 1)) + size;
-    return true;
-  }
-  bool skipSized(size_t alignment, size_t elementAlignment, size_t terminator) {
-    at_ = (at_ + alignment - 1) & ~(alignment - 1);
-    if (!fits(4)) return false;
-    const size_t size = load<uint32_t>(begin_ + at_, swapped_);
-    at_ = (at_ + 4 + elementAlignment - 1) & ~(elementAlignment - 1);
-    at_ += size + terminator;
-    return at_ <= end_;
-  }
 
-  const uint8_t* begin_;
-  size_t at_, end_;
-  bool swapped_;
+  alignas(DictionaryEntry) std::byte storage_[kMost * sizeof(DictionaryEntry)];
   size_t count_ = 0;
-  uint32_t prints_[kMaxEntries];
-  uint32_t keys_[kMaxEntries];
+  uint64_t seen_ = 0;
 };
 
 Value variantValue(Cursor& c, int depth);
 Value containerValue(Cursor& c, std::string_view type, int depth);
 
-// A value of a basic type.
-Value basicValue(Cursor& c, char type) {
+Value rareValue(Cursor& c, char type);
+
+// A value of a basic type; here those that our own client library sends.
+KYT_HOT Value basicValue(Cursor& c, char type) {
   switch (type) {
     case 's': {
       std::string_view view;
-      return text(c, view) ? Value(String(view)) : Value();
+      if (!text(c, view)) [[unlikely]]
+        return {};
+      return String(view);
     }
-    case 'y':
-      if (left(c) == 0) return malformed(c, "a value is cut off"), Value();
-      return Value(unsigned{*c.at++});
     case 'b': {
       bool v = false;
       return boolean(c, v) ? Value(v) : Value();
     }
+    case 'x': {
+      uint64_t v = 0;
+      return number(c, v) ? Value(static_cast<int64_t>(v)) : Value();
+    }
+    case 't': {
+      uint64_t v = 0;
+      return number(c, v) ? Value(v) : Value();
+    }
+    case 'd': {
+      uint64_t v = 0;
+      return number(c, v) ? Value(std::bit_cast<double>(v)) : Value();
+    }
+    default:
+      return rareValue(c, type);
+  }
+}
+
+[[gnu::noinline]] Value rareValue(Cursor& c, char type) {
+  switch (type) {
+    case 'y':
+      if (left(c) == 0) return malformed(c, "a value is cut off"), Value();
+      return Value(unsigned{*c.at++});
     case 'n': {
       uint16_t v = 0;
       return number(c, v) ? Value(int{static_cast<int16_t>(v)}) : Value();
@@ -298,18 +262,6 @@ Value basicValue(Cursor& c, char type) {
     case 'u': {
       uint32_t v = 0;
       return number(c, v) ? Value(unsigned{v}) : Value();
-    }
-    case 'x': {
-      uint64_t v = 0;
-      return number(c, v) ? Value(static_cast<int64_t>(v)) : Value();
-    }
-    case 't': {
-      uint64_t v = 0;
-      return number(c, v) ? Value(v) : Value();
-    }
-    case 'd': {
-      uint64_t v = 0;
-      return number(c, v) ? Value(std::bit_cast<double>(v)) : Value();
     }
     case 'o': {
       std::string_view view;
@@ -354,23 +306,32 @@ Value variantValue(Cursor& c, int depth) {
   return valueOf(c, type, depth + 1);
 }
 
+Value entryValue(Cursor& c, std::string_view type, int depth) {
+  return type[0] == 'v' ? variantValue(c, depth) : valueOf(c, type, depth);
+}
+
 // The entries of a{sX}. `depth`: how many containers are around the array.
 bool dictionary(Cursor& c, std::string_view valueType, Dictionary& out, int depth) {
   const uint8_t* end = nullptr;
   if (!enter(c, depth) || !array<8>(c, end)) return false;
   if (c.at == end) return true;
   if (!enter(c, depth + 1)) return false;
-  const EntryScan scan(c, end, valueType[0]);
-  if (scan.count() != 0) out.reserve(scan.count());
+  EntryGatherer first;
+  while (c.at < end && !first.full()) {
+    std::string_view key;
+    if (!align<8>(c) || !text(c, key)) return false;
+    ::new (first.next()) DictionaryEntry{String(key), entryValue(c, valueType, depth + 2)};
+    first.gathered();
+    if (c.status != BodyStatus::ok) [[unlikely]]
+      return false;
+  }
+  out = first.take();
   while (c.at < end) {
     std::string_view key;
     if (!align<8>(c) || !text(c, key)) return false;
-    Value value = valueType[0] == 'v' ? variantValue(c, depth + 2) : valueOf(c, valueType, depth + 2);
+    Value value = entryValue(c, valueType, depth + 2);
     if (c.status != BodyStatus::ok) return false;
-    if (scan.count() != 0) [[likely]]
-      out.append(String(key), std::move(value));
-    else
-      out.set(String(key), std::move(value));
+    out.set(String(key), std::move(value));
   }
   return endOfArray(c, end);
 }
@@ -429,6 +390,8 @@ Value containerValue(Cursor& c, std::string_view type, int depth) {
   }
   return read ? Value(std::move(array)) : Value();
 }
+
+#undef KYT_HOT
 
 }  // namespace
 

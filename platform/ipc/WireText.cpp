@@ -26,14 +26,6 @@ bool is(char c, unsigned classes) {
   return (kClasses[static_cast<uint8_t>(c)] & classes) != 0;
 }
 
-constexpr uint64_t kOnes = 0x0101010101010101u;
-constexpr uint64_t kHighs = 0x8080808080808080u;
-
-// High bits in the bytes of `word` that are no ASCII or (at least the first of them) NUL.
-uint64_t special(uint64_t word) {
-  return (word | (word - kOnes)) & kHighs;
-}
-
 uint64_t load(const char* at) {
   uint64_t word;
   std::memcpy(&word, at, sizeof word);
@@ -56,24 +48,6 @@ size_t sequenceLength(const unsigned char* at, size_t left) {
   if (lead == 0xF0 && at[1] < 0x90) return 0;  // overlong
   if (lead == 0xF4 && at[1] > 0x8F) return 0;  // above U+10FFFF
   return 4;
-}
-
-bool isValidTextSlow(std::string_view text) noexcept {
-  const auto* at = reinterpret_cast<const unsigned char*>(text.data());
-  const unsigned char* const end = at + text.size();
-  while (at != end) {
-    if (end - at >= 8 && special(load(reinterpret_cast<const char*>(at))) == 0) {
-      at += 8;
-    } else if (*at < 0x80) {
-      if (*at == 0) return false;
-      ++at;
-    } else {
-      const size_t length = sequenceLength(at, static_cast<size_t>(end - at));
-      if (length == 0) return false;
-      at += length;
-    }
-  }
-  return true;
 }
 
 // Elements of letters, digits and underscores (and hyphens where admitted) between dots, at least two of
@@ -131,22 +105,22 @@ size_t completeType(std::string_view s, int arrays, int structs) noexcept {
 
 }  // namespace
 
-bool isValidText(std::string_view text) noexcept {
-  const char* at = text.data();
-  size_t left = text.size();
-  if (left >= 8) {
-    for (; left > 8; at += 8, left -= 8) {
-      if (special(load(at)) != 0) return isValidTextSlow({at, left});
+bool isValidUnicode(std::string_view text) noexcept {
+  const auto* at = reinterpret_cast<const unsigned char*>(text.data());
+  const unsigned char* const end = at + text.size();
+  while (at != end) {
+    if (end - at >= 8 && notPlain(load(reinterpret_cast<const char*>(at))) == 0) {
+      at += 8;
+    } else if (*at < 0x80) {
+      if (*at == 0) return false;
+      ++at;
+    } else {
+      const size_t length = sequenceLength(at, static_cast<size_t>(end - at));
+      if (length == 0) return false;
+      at += length;
     }
-    // The last eight bytes, which may overlap the ones before.
-    return special(load(text.data() + text.size() - 8)) == 0 || isValidTextSlow({at, left});
   }
-  unsigned char bad = 0;
-  for (size_t i = 0; i < left; ++i) {
-    const auto c = static_cast<unsigned char>(at[i]);
-    bad |= static_cast<unsigned char>((c - 1) | c);
-  }
-  return bad < 0x80 || isValidTextSlow(text);
+  return true;
 }
 
 void appendValidText(std::string_view text, std::string& out) {

@@ -1,0 +1,208 @@
+// Decoding of one SendMessageWithDictionary call, as the server does it: framing, header, body, all checks,
+// into objects. The reference decodes the same bytes with the same checks into one flat reserved array, in
+// two forms: of the same strings and values as objects, without the dictionaries around them (what the goal
+// of 1.3 is measured against), and of views into the buffer, which own nothing.
+#include <benchmark/benchmark.h>
+
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "bench/Corpus.h"
+#include "platform/Value.h"
+#include "platform/ipc/BodyReader.h"
+#include "platform/ipc/MessageReader.h"
+#include "platform/ipc/MessageWriter.h"
+#include "platform/ipc/WireText.h"
+
+namespace {
+
+using namespace kyt;
+
+const std::vector<std::string>& calls() {
+  static const std::vector<std::string> all = [] {
+    std::vector<std::string> made;
+    for (const Dictionary& payload : bench::corpusPayloads(256)) {
+      std::string& bytes = made.emplace_back();
+      bench::appendEventCall(bytes, static_cast<uint32_t>(made.size()), 3, payload);
+    }
+    return made;
+  }();
+  return all;
+}
+
+// The flat decoder: little-endian, entries of a{sv} in the order of the bytes, nested ones too.
+template <typename Sink>
+class FlatDecoder {
+ public:
+  FlatDecoder(const Message& message, Sink& sink)
+      : begin_(reinterpret_cast<const uint8_t*>(message.body.data())),
+        at_(begin_),
+        end_(begin_ + message.body.size()),
+        sink_(sink) {}
+  bool decode() { return entries(0) && at_ == end_; }
+
+ private:
+  bool align(size_t n) {
+    while ((static_cast<size_t>(at_ - begin_) & (n - 1)) != 0) {
+      if (at_ == end_ || *at_++ != 0) return false;
+    }
+    return true;
+  }
+  template <typename T>
+  bool number(T& out) {
+    if (!align(sizeof(T)) || static_cast<size_t>(end_ - at_) < sizeof(T)) return false;
+    std::memcpy(&out, at_, sizeof(T));
+    at_ += sizeof(T);
+    return true;
+  }
+  bool text(std::string_view& out) {
+    uint32_t length = 0;
+    if (!number(length) || static_cast<size_t>(end_ - at_) <= length) return false;
+    out = {reinterpret_cast<const char*>(at_), length};
+    if (at_[length] != 0 || !wire::isValidText(out)) return false;
+    at_ += length + 1;
+    return true;
+  }
+  bool entries(int depth) {
+    uint32_t length = 0;
+    if (depth > 20 || !number(length) || !align(8) || static_cast<size_t>(end_ - at_) < length) return false;
+    const uint8_t* const end = at_ + length;
+    while (at_ < end) {
+      std::string_view key;
+      if (!align(8) || !text(key) || !variant(key, depth)) return false;
+    }
+    return at_ == end;
+  }
+  bool variant(std::string_view key, int depth) {
+    if (end_ - at_ < 3) return false;
+    const size_t length = *at_;
+    if (static_cast<size_t>(end_ - at_) < length + 2 || at_[length + 1] != 0) return false;
+    const std::string_view type(reinterpret_cast<const char*>(at_ + 1), length);
+    at_ += length + 2;
+    if (type == "a{sv}") return entries(depth + 1);
+    if (!wire::isValidSingleSignature(type)) return false;
+    switch (type[0]) {
+      case 's': {
+        std::string_view value;
+        if (!text(value)) return false;
+        sink_.add(key, value);
+        return true;
+      }
+      case 'x': {
+        int64_t value = 0;
+        if (!number(value)) return false;
+        sink_.add(key, value);
+        return true;
+      }
+      case 't': {
+        uint64_t value = 0;
+        if (!number(value)) return false;
+        sink_.add(key, value);
+        return true;
+      }
+      case 'd': {
+        double value = 0;
+        if (!number(value)) return false;
+        sink_.add(key, value);
+        return true;
+      }
+      case 'b': {
+        uint32_t value = 0;
+        if (!number(value) || value > 1) return false;
+        sink_.add(key, value == 1);
+        return true;
+      }
+      default:
+        return false;
+    }
+  }
+  const uint8_t *begin_, *at_, *end_;
+  Sink& sink_;
+};
+
+struct ObjectSink {
+  ObjectSink() { entries.reserve(16); }
+  template <typename T>
+  void add(std::string_view key, T value) {
+    entries.push_back({String(key), Value(value)});
+  }
+  std::vector<DictionaryEntry> entries;
+};
+
+struct ViewSink {
+  struct Entry {
+    std::string_view key, text;
+    uint64_t bits;
+    char type;
+  };
+  ViewSink() { entries.reserve(16); }
+  void add(std::string_view key, std::string_view text) { entries.push_back({key, text, 0, 's'}); }
+  void add(std::string_view key, int64_t v) { entries.push_back({key, {}, static_cast<uint64_t>(v), 'x'}); }
+  void add(std::string_view key, uint64_t v) { entries.push_back({key, {}, v, 't'}); }
+  void add(std::string_view key, bool v) { entries.push_back({key, {}, v, 'b'}); }
+  void add(std::string_view key, double v) {
+    uint64_t bits = 0;
+    std::memcpy(&bits, &v, 8);
+    entries.push_back({key, {}, bits, 'd'});
+  }
+  std::vector<Entry> entries;
+};
+
+void decodeIntoObjects(benchmark::State& state) {
+  size_t next = 0;
+  for (auto _ : state) {
+    const std::string& bytes = calls()[next++ % calls().size()];
+    Message message;
+    const Frame frame = readMessage(std::as_bytes(std::span(bytes)), 1048576, message);
+    BodyReader reader(message);
+    Dictionary dictionary;
+    const bool read = frame.status == FrameStatus::complete && reader.hasSignature("a{sv}") &&
+                      reader.readDictionary(dictionary) && reader.finish() == BodyStatus::ok;
+    if (!read || dictionary.size() < 3) state.SkipWithError("the call was not decoded");
+    benchmark::DoNotOptimize(dictionary);
+  }
+}
+BENCHMARK(decodeIntoObjects);
+
+template <typename Sink>
+void decodeFlat(benchmark::State& state) {
+  size_t next = 0;
+  for (auto _ : state) {
+    const std::string& bytes = calls()[next++ % calls().size()];
+    Message message;
+    const Frame frame = readMessage(std::as_bytes(std::span(bytes)), 1048576, message);
+    Sink sink;
+    const bool read = frame.status == FrameStatus::complete && message.signature == "a{sv}" &&
+                      FlatDecoder<Sink>(message, sink).decode();
+    if (!read || sink.entries.size() < 12) state.SkipWithError("the call was not decoded");
+    benchmark::DoNotOptimize(sink);
+  }
+}
+BENCHMARK_TEMPLATE(decodeFlat, ObjectSink);
+BENCHMARK_TEMPLATE(decodeFlat, ViewSink);
+
+void readHeaderAlone(benchmark::State& state) {
+  size_t next = 0;
+  for (auto _ : state) {
+    const std::string& bytes = calls()[next++ % calls().size()];
+    Message message;
+    benchmark::DoNotOptimize(readMessage(std::as_bytes(std::span(bytes)), 1048576, message));
+    benchmark::DoNotOptimize(message);
+  }
+}
+BENCHMARK(readHeaderAlone);
+
+void encodeOneCall(benchmark::State& state) {
+  const std::vector<Dictionary> payloads = bench::corpusPayloads(256);
+  std::string bytes;
+  size_t next = 0;
+  for (auto _ : state) {
+    bytes.clear();
+    bench::appendEventCall(bytes, 1, 3, payloads[next++ % payloads.size()]);
+    benchmark::DoNotOptimize(bytes);
+  }
+}
+BENCHMARK(encodeOneCall);
+
+}  // namespace
