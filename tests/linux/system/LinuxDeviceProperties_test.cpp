@@ -8,6 +8,10 @@
 #include <systemd/sd-id128.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "platform/fake/FakeUserDefaults.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
@@ -224,6 +228,26 @@ TEST_F(LinuxDevicePropertiesTest, AChangeOfTheZoneCountsFromTheNextMinute) {
               return offsets + std::to_string(properties.secondsFromGMT({-61, 0}));
             }),
             "-19800 -19800 50400 50400 50400");
+}
+
+TEST_F(LinuxDevicePropertiesTest, ThreadsInDifferentMinutesGetTheirOwnOffsets) {
+  EXPECT_EQ(inChildProcess([&]() -> std::string {
+              ::setenv("TZ", "CET-1CEST,M3.5.0,M10.5.0/3", 1);
+              auto properties = make();
+              std::atomic<int> wrong = 0;
+              std::vector<std::thread> threads;
+              for (int64_t side : {-1, 0}) {
+                threads.emplace_back([&properties, &wrong, side] {
+                  for (int i = 0; i < 2000; ++i) {
+                    if (properties.secondsFromGMT({kSummerBegins + side, 0}) != (side < 0 ? 3600 : 7200))
+                      ++wrong;
+                  }
+                });
+              }
+              for (std::thread& thread : threads) thread.join();
+              return std::to_string(wrong);
+            }),
+            "0");
 }
 
 TEST_F(LinuxDevicePropertiesTest, AnotherLocaltimeFileCountsFromTheNextMinute) {

@@ -2,13 +2,19 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "platform/Keys.h"
 #include "platform/fake/MemoryLogSink.h"
+#include "tests/support/ChildProcess.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -228,6 +234,44 @@ TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatI
   for (int i = 0; i < 3; ++i) EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
   EXPECT_EQ(
       sink_.count(LogLevel::error, "entitlements: Grants by executable cannot match: Permission denied"), 1u);
+}
+
+TEST_F(TomlEntitlementsTest, AnswersSeveralThreadsWhileFilesChange) {
+  grant("user = 5\n");
+  std::atomic<int> wrong = 0;
+  std::atomic<bool> done = false;
+  std::vector<std::thread> threads;
+  for (int i = 0; i < 3; ++i) {
+    threads.emplace_back([&] {
+      do {
+        if (!isGranted(peer(5)) || isGranted(peer(6))) ++wrong;
+      } while (!done);
+    });
+  }
+  for (int i = 0; i < 20; ++i) grant("user = 1000\n", "b" + std::to_string(i) + ".toml");
+  done = true;
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(wrong, 0);
+}
+
+TEST(ProgramInspectorProcess, EndsWithTheDaemonHoweverThatEnds) {
+  EXPECT_EQ(
+      inChildProcess([]() -> std::string {
+        ::prctl(PR_SET_CHILD_SUBREAPER, 1);  // whoever loses its parent becomes this process's child
+        const pid_t daemon = ::fork();
+        if (daemon == 0) {
+          auto started = ProgramInspectorProcess::start();
+          if (started.index() != 0 || std::get<0>(started)->runningProgram(1).index() > 1) ::_exit(1);
+          ::raise(SIGKILL);
+        }
+        int status = 0;
+        if (::waitpid(daemon, &status, 0) != daemon || !WIFSIGNALED(status))
+          return "the daemon was not killed";
+        const pid_t inspector = ::waitpid(-1, &status, 0);
+        if (inspector <= 0) return "there was no inspector";
+        return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? "" : "it ended with " + std::to_string(status);
+      }),
+      "");
 }
 
 TEST(ProgramInspectorProcess, AnswersLikeAskingDirectly) {
