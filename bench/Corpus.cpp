@@ -34,22 +34,20 @@ class Draws {
 
 std::vector<Dictionary> corpusPayloads(size_t count) {
   Draws draws(20260131);
-  const std::vector<std::string> networks = {"wifi", "cellular", "ethernet"},
-                                 codecs = {"h264", "hevc", "av1", "opus"},
-                                 results = {"completed", "declined", "timed out", "failed"};
+  const std::vector<std::string> networks = {"wifi", "cellular", "ethernet"};
   std::vector<Dictionary> out;
   for (size_t i = 0; i < count; ++i) {
     Dictionary payload;
-    payload.set("callID", draws.hex(16));
+    payload.set("callID", draws.hex(32));
+    payload.set("peerID", draws.hex(32));
     payload.set("network", draws.word(networks));
-    payload.set("codec", draws.word(codecs));
-    payload.set("result", draws.word(results));
-    payload.set("duration", static_cast<double>(draws.below(3600000)) / 1000.0);
-    payload.set("bitrate", static_cast<int64_t>(draws.below(4000)) * 1000);
-    payload.set("packetLoss", static_cast<double>(draws.below(1000)) / 10000.0);
-    payload.set("jitter", static_cast<int64_t>(draws.below(80)));
+    payload.set("route", draws.hex(40));
+    payload.set("nonce", draws.hex(40));
+    payload.set("duration", static_cast<double>(draws.below(1u << 31)) / 1048576.0);
+    payload.set("bitrate", static_cast<int64_t>(draws.below(4000000)));
+    payload.set("packetLoss", static_cast<double>(draws.below(1u << 31)) / 4294967296.0);
+    payload.set("jitter", static_cast<double>(draws.below(1u << 31)) / 33554432.0);
     payload.set("relayed", draws.below(2) == 1);
-    payload.set("retries", static_cast<int64_t>(draws.below(4)));
     out.push_back(std::move(payload));
   }
   return out;
