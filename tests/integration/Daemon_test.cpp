@@ -66,7 +66,7 @@ TEST_F(Daemon, StartsInOrderAndEndsOnSIGTERM) {
   EXPECT_LT(log.find("<6>startLogging: Daemon starts logging..."),
             log.find("<6>main: Listener resumes with sandbox, start loop."));
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("main: Ending on signal 15"));
   EXPECT_FALSE(std::filesystem::exists(daemon_.socketPath()));
 }
@@ -74,7 +74,7 @@ TEST_F(Daemon, StartsInOrderAndEndsOnSIGTERM) {
 TEST_F(Daemon, EndsOnSIGINTToo) {
   ASSERT_TRUE(daemon_.startAndWait());
   daemon_.terminate(SIGINT);
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
 }
 
 TEST_F(Daemon, WithoutSettingsDoesNotStart) {
@@ -91,7 +91,7 @@ TEST_F(Daemon, TakesItsSettingsFromAnotherFile) {
   daemon_.start({"--config", file});
   EXPECT_TRUE(eventually([this] { return daemon_.logged("start loop."); })) << daemon_.log();
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
 }
 
 TEST_F(Daemon, AWrongSettingIsAStartUpErrorWithItsLine) {
@@ -130,7 +130,7 @@ TEST_F(Daemon, ASecondOneDoesNotTakeTheFirstOnesPlace) {
   EXPECT_EQ(second.exitStatus(), 1);
   EXPECT_TRUE(second.logged("Another process listens at")) << second.log();
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
 }
 
 TEST_F(Daemon, PostsWhatASessionHoldsWhenItEnds) {
@@ -143,7 +143,7 @@ TEST_F(Daemon, PostsWhatASessionHoldsWhenItEnds) {
   EXPECT_TRUE(eventually([this] { return posts() == 1; })) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("finishSessionGracefully: Session 77 has been finished gracefully"));
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
 }
 
 TEST_F(Daemon, PostsWhatSessionsHoldOnSIGTERM) {
@@ -157,7 +157,7 @@ TEST_F(Daemon, PostsWhatSessionsHoldOnSIGTERM) {
                      [&](Value, std::optional<Error>) { answered1 = true; });
   ASSERT_TRUE(answered(answered1));
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_EQ(posts(), 2U) << "the batch of each session, start and stop messages included";
   EXPECT_TRUE(daemon_.logged("shutDown: 3 requests started, 3 completed, 0 failed")) << daemon_.log();
 }
@@ -174,7 +174,7 @@ TEST_F(Daemon, ASlowServerIsWaitedForUntilTheDeadline) {
   never.behaviour = TestHTTPServer::Behaviour::hold;
   server_.setReply(never);
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("shutDown: Cancelling 1 requests that have not been answered in time"))
       << daemon_.log();
 }
@@ -189,7 +189,7 @@ TEST_F(Daemon, SIGTERMCancelsADownload) {
   ASSERT_TRUE(server_.waitForRequests(1));
   const auto begin = std::chrono::steady_clock::now();
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(5))
       << "the request's own limit is 15 s";
   EXPECT_TRUE(daemon_.logged("fetchAndCacheStorebag: Unable to fetch storebag for client type 5"))
@@ -210,14 +210,14 @@ TEST_F(Daemon, ManyClientsOfOneStorebagFetchItOnce) {
   EXPECT_EQ(server_.requestCount(), 1U);
   clients.clear();
   daemon_.terminate();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
 }
 
 TEST_F(Daemon, ActivatedByASocketEndsWhenIdle) {
   serve();
   daemon_.activateBySocket();
   ASSERT_TRUE(daemon_.startAndWait()) << daemon_.log();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("main: Ending, idle for 0.2 seconds")) << daemon_.log();
   EXPECT_TRUE(std::filesystem::exists(daemon_.socketPath())) << "the socket is the service manager's";
 }
@@ -238,7 +238,7 @@ TEST_F(Daemon, ActivatedByASocketStaysWhileASessionExists) {
   }
   EXPECT_FALSE(daemon_.logged("main: Ending"));
   client.reset();
-  EXPECT_EQ(daemon_.exitStatus(), 0);
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("main: Ending, idle for 0.2 seconds"));
 }
 

@@ -240,6 +240,9 @@ int64_t LinuxDeviceProperties::secondsFromGMT(TimeValue time) {
   const uint64_t wanted = static_cast<uint64_t>(minute + (int64_t{1} << 38)) & ((uint64_t{1} << 40) - 1);
   const uint64_t known = offset_.load(std::memory_order_relaxed);
   if (known != 0 && known >> 24 == wanted) return static_cast<int64_t>(known & 0xFFFFFF) - kOffsetBias;
+  // One thread at a time: the C library has a lock of its own for this, but the thread sanitizer does not see
+  // it.
+  MutexLock lock(zoneMutex_);
   // Without TZ the C library looks here whether /etc/localtime is another file than before.
   ::tzset();
   const time_t seconds = time.seconds;

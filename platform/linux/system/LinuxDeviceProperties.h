@@ -60,6 +60,7 @@ class LinuxDeviceProperties final : public DeviceProperties {
   Cryptography& cryptography_;
   Log& log_;
   std::atomic<uint64_t> offset_ = 0;  // minute << 24 | (offset + kOffsetBias); 0: not looked up yet
+  Mutex zoneMutex_;                   // around the C library's look-up
   Mutex mutex_;
   FlatTomlFile overrides_ GUARDED_BY(mutex_);
 };
