@@ -32,6 +32,7 @@ URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& sessi
           network.deadlines(),
           [](void* pool) {
             auto* idle = static_cast<URLConnectionPool*>(pool);
+            idle->network_.idlePools().remove(*idle);
             idle->network_.closePool(idle->session_, idle->number_);
           },
           this) {
@@ -45,6 +46,7 @@ URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& sessi
 }
 
 URLConnectionPool::~URLConnectionPool() {
+  leaveIdle();
   for (CURL* handle : idleHandles_) curl_easy_cleanup(handle);
   if (multi_ != nullptr) curl_multi_cleanup(multi_);
 }
@@ -80,6 +82,7 @@ CURL* URLConnectionPool::takeHandle() {
   curl_easy_setopt(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
   curl_easy_setopt(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
   curl_easy_setopt(handle, CURLOPT_SSL_CTX_DATA, &network_);
+  curl_easy_setopt(handle, CURLOPT_BUFFERSIZE, 4096L);  // replies are small, sessions many
   curl_easy_setopt(handle, CURLOPT_TCP_NODELAY, 1L);
   curl_easy_setopt(handle, CURLOPT_CONNECTTIMEOUT_MS,
                    std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
@@ -101,7 +104,7 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   }
   transfer.handle = handle;
   ++active_;
-  idle_.cancel();
+  leaveIdle();
   return CURLE_OK;
 }
 
@@ -121,8 +124,15 @@ void URLConnectionPool::remove(URLTransfer& transfer) {
 
 void URLConnectionPool::closeIfIdle() {
   if (active_ != 0) return;
+  leaveIdle();
   const bool now = session_.invalidated.load();
   idle_.set(now ? network_.now() : network_.now() + network_.options().idleConnectionTime);
+  if (URLConnectionPool* surplus = network_.idlePools().add(*this)) surplus->idle_.set(network_.now());
+}
+
+void URLConnectionPool::leaveIdle() {
+  idle_.cancel();
+  network_.idlePools().remove(*this);
 }
 
 int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {

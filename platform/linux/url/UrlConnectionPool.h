@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/linux/url/DeadlineHeap.h"
+#include "platform/linux/url/LinkedList.h"
 
 namespace kyt {
 
@@ -28,8 +29,12 @@ class URLConnectionPool {
   void socketReady(int socket, uint32_t events);
   // Frees itself from the event loop, soon, when nothing is in it.
   void closeIfIdle();
+  // Among the idle ones that are kept.
+  Links<URLConnectionPool> links;
+  bool isKept = false;
 
  private:
+  void leaveIdle();
   static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
   static int timerChanged(CURLM* multi, long milliseconds, void* pool);
   [[nodiscard]] CURL* takeHandle();

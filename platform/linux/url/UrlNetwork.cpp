@@ -40,6 +40,7 @@ URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counte
     : options_(std::move(options)),
       log_(log),
       counters_(counters),
+      idlePools_(options_.maxIdlePools),
       routes_(options_.cellularInterfaces, options_.sysClassNet, options_.resolverFile),
       certificates_(options_.certificateFile),
       settle_(

@@ -26,6 +26,31 @@
 
 namespace kyt {
 
+// The pools that are idle, longest first; the number of those kept has a limit.
+class IdlePools {
+ public:
+  explicit IdlePools(size_t most) : most_(most) {}
+  // One that is too much now and is no longer among them, or null.
+  [[nodiscard]] URLConnectionPool* add(URLConnectionPool& pool) {
+    pools_.append(pool);
+    pool.isKept = true;
+    if (++count_ <= most_) return nullptr;
+    URLConnectionPool* surplus = pools_.first();
+    remove(*surplus);
+    return surplus;
+  }
+  void remove(URLConnectionPool& pool) {
+    if (!std::exchange(pool.isKept, false)) return;
+    pools_.remove(pool);
+    --count_;
+  }
+
+ private:
+  const size_t most_;
+  size_t count_ = 0;
+  LinkedList<URLConnectionPool> pools_;
+};
+
 class URLNetwork {
  public:
   URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counters);
@@ -46,6 +71,7 @@ class URLNetwork {
   // The network thread's, for pools and transfers.
   [[nodiscard]] MonotonicTime now() const { return now_; }
   [[nodiscard]] DeadlineHeap& deadlines() { return deadlines_; }
+  [[nodiscard]] IdlePools& idlePools() { return idlePools_; }
   [[nodiscard]] RouteTable& routes() { return routes_; }
   [[nodiscard]] CertificateStore& certificates() { return certificates_; }
   [[nodiscard]] const CurlURLSessionOptions& options() const { return options_; }
@@ -118,6 +144,7 @@ class URLNetwork {
   // The network thread's.
   MonotonicTime now_;
   DeadlineHeap deadlines_;
+  IdlePools idlePools_;
   RouteTable routes_;
   RouteEvents routeEvents_;
   CertificateStore certificates_;

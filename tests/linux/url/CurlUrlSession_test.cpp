@@ -122,6 +122,34 @@ TEST_F(CurlURLSession, ClosesIdleConnections) {
   EXPECT_EQ(server_.connectionsAccepted(), 2u);
 }
 
+TEST_F(CurlURLSession, ClosesTheLongestIdleConnectionsWhenTooManySessionsHaveSome) {
+  options_.maxIdlePools = 2;
+  auto one = session(), two = session(), three = session();
+  for (URLSession* urls : {one.get(), two.get(), three.get()})
+    EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_TRUE(server_.waitForConnectionsOpen(2));
+  EXPECT_EQ(server_.connectionsAccepted(), 3u);
+  EXPECT_EQ(perform(*three, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(perform(*two, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 3u);
+  EXPECT_EQ(perform(*one, get(server_.url("/"))).status(), 200);
+  EXPECT_EQ(server_.connectionsAccepted(), 4u);
+  EXPECT_TRUE(server_.waitForConnectionsOpen(2));
+}
+
+TEST_F(CurlURLSession, ClosesAllSurplusConnectionsOfABurst) {
+  options_.maxIdlePools = 3;
+  server_.setReply(reply(Behaviour::hold));
+  std::vector<std::unique_ptr<URLSession>> many(20);
+  for (auto& one : many) {
+    one = session();
+    one->start(get(server_.url("/")), nullptr);
+  }
+  ASSERT_TRUE(server_.waitForRequests(20));
+  server_.release();
+  EXPECT_TRUE(server_.waitForConnectionsOpen(3));
+}
+
 TEST_F(CurlURLSession, ClosesItsConnectionsWhenItIsInvalidated) {
   auto urls = session();
   EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
