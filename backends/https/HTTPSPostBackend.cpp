@@ -54,6 +54,8 @@ HTTPSPostBackend::HTTPSPostBackend(Configuration& configuration, String name, Di
 
 HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
+  // What no flush took is lost with the session. Nobody else can reach the batch any more.
+  if (batchedEvents_) platform_.counters.add(Reason::batchDiscarded, batchedEvents_->size());
 }
 
 void HTTPSPostBackend::readUserDefaults() {
