@@ -149,7 +149,7 @@ struct ViewSink {
   std::vector<Entry> entries;
 };
 
-void decodeIntoObjects(benchmark::State& state) {
+void DecodeEventCall(benchmark::State& state) {
   size_t next = 0;
   for (auto _ : state) {
     const std::string& bytes = calls()[next++ % calls().size()];
@@ -163,10 +163,10 @@ void decodeIntoObjects(benchmark::State& state) {
     benchmark::DoNotOptimize(dictionary);
   }
 }
-BENCHMARK(decodeIntoObjects);
+BENCHMARK(DecodeEventCall);
 
 template <typename Sink>
-void decodeFlat(benchmark::State& state) {
+void FlatDecodeOfEventCall(benchmark::State& state) {
   size_t next = 0;
   for (auto _ : state) {
     const std::string& bytes = calls()[next++ % calls().size()];
@@ -179,10 +179,10 @@ void decodeFlat(benchmark::State& state) {
     benchmark::DoNotOptimize(sink);
   }
 }
-BENCHMARK_TEMPLATE(decodeFlat, ObjectSink);
-BENCHMARK_TEMPLATE(decodeFlat, ViewSink);
+BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ObjectSink);
+BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ViewSink);
 
-void readHeaderAlone(benchmark::State& state) {
+void ReadHeaderOfEventCall(benchmark::State& state) {
   size_t next = 0;
   for (auto _ : state) {
     const std::string& bytes = calls()[next++ % calls().size()];
@@ -191,9 +191,9 @@ void readHeaderAlone(benchmark::State& state) {
     benchmark::DoNotOptimize(message);
   }
 }
-BENCHMARK(readHeaderAlone);
+BENCHMARK(ReadHeaderOfEventCall);
 
-void encodeOneCall(benchmark::State& state) {
+void EncodeEventCall(benchmark::State& state) {
   const std::vector<Dictionary> payloads = bench::corpusPayloads(256);
   std::string bytes;
   size_t next = 0;
@@ -203,6 +203,6 @@ void encodeOneCall(benchmark::State& state) {
     benchmark::DoNotOptimize(bytes);
   }
 }
-BENCHMARK(encodeOneCall);
+BENCHMARK(EncodeEventCall);
 
 }  // namespace
