@@ -400,5 +400,54 @@ TEST_F(HTTPSPostBackendState, AFlushThatWasShownFreezesTheState) {
   EXPECT_EQ(backend().state(), kBackendStateHeld);
 }
 
+// A bag is signed, but what signs it may be wrong about types: every key with every kind of object, alone and
+// inside the containers that are looked into.
+TEST_F(HTTPSPostBackendState, NoTypeInTheEntryDoesHarm) {
+  const std::byte bytes[] = {std::byte{1}};
+  const double nan = std::numeric_limits<double>::quiet_NaN();
+  const std::vector<Value> objects{Value(), true,      -5, 18446744073709551615u, 1e300,
+                                   nan,     Date{nan}, "", "text, text",          Data(bytes)};
+  std::vector<Value> kinds = objects;
+  for (const Value& object : objects) {
+    kinds.push_back(Value(Array{object, Array{object}}));
+    for (const char* key : {"key", "action", "method", "status", "country", "threshold"})
+      kinds.push_back(Value(Array{Dictionary{{key, object}}, Dictionary{{"country", Array{object}}}}));
+    kinds.push_back(Value(Dictionary{{"key", object}}));
+  }
+  for (const char* key : {"client",
+                          "service",
+                          "enabledSince",
+                          "expedite",
+                          "override_dnu",
+                          "locale_whitelist",
+                          "device_whitelist",
+                          "device_blacklist",
+                          "filters",
+                          "sampling_threshold",
+                          "per_country_sampling_thresholds",
+                          "override_sampling",
+                          "event_threshold",
+                          "extras_on_internal",
+                          "custom_clientId",
+                          "post_url",
+                          "realtime_post_url",
+                          "event_whitelist",
+                          "event_blacklist",
+                          "use_wifi_only"}) {
+    for (const Value& kind : kinds) {
+      Dictionary entry = entry_;
+      entry.set(key, kind);
+      make({entry}).updateState();
+      EXPECT_GE(backend().state(), kBackendStateUndecided);
+      EXPECT_LE(backend().state(), kBackendStateHeld);
+      send(5);
+      send(6, {{"email", kind}}, 1);
+      backend().setRequireUserInfo(false);
+      backend().updateState();
+      backend().flushMessagesWithCompletion(nullptr);
+    }
+  }
+}
+
 }  // namespace
 }  // namespace kyt
