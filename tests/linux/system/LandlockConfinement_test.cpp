@@ -125,6 +125,15 @@ TEST_F(LandlockConfinementTest, MakesReplacesAndRemovesFilesInAWritableFolder) {
             "");
 }
 
+TEST_F(LandlockConfinementTest, CutsNoFileThatMayOnlyBeRead) {
+  if (landlockVersion() < 3) GTEST_SKIP() << "this kernel's Landlock does not know truncation";
+  EXPECT_EQ(confined([&] {
+              return expectError("truncate", errorOf(::truncate((folder_ / "read/file").c_str(), 0)), EACCES);
+            }),
+            "");
+  EXPECT_EQ(folder_.read("read/file"), "r");
+}
+
 TEST_F(LandlockConfinementTest, RunsNoProgram) {
   std::filesystem::copy_file("/bin/true", folder_ / "read/program");
   EXPECT_EQ(confined([&] {

@@ -2,8 +2,10 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/mount.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -13,6 +15,7 @@
 #include "platform/Limits.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
+#include "tests/support/ChildProcess.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -71,6 +74,28 @@ TEST_F(TomlUserDefaultsTest, AChangeCountsAtOnceAlsoWithinOneTick) {
   }
   ::unlink((folder_ / kFile).c_str());
   EXPECT_TRUE(defaults.value(kDomain, "n").isNull());
+}
+
+// Where the kernel stamps files by its slow clock, changes within one tick leave the same times.
+TEST_F(TomlUserDefaultsTest, AChangeCountsAtOnceOnAFileSystemWithCoarseTimes) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to mount a file system";
+  EXPECT_EQ(inChildProcess([&]() -> std::string {
+              if (::unshare(CLONE_NEWNS) != 0 ||
+                  ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+                  ::mount("ramfs", folder_.path().c_str(), "ramfs", 0, nullptr) != 0) {
+                return "no mount";
+              }
+              auto defaults = make();
+              folder_.write(kFile, "n = 100\n");
+              const int file = ::open((folder_ / kFile).c_str(), O_WRONLY);
+              for (int i = 101; i < 900; ++i) {
+                if (defaults.value(kDomain, "n") != Value(i - 1)) return "old value at " + std::to_string(i);
+                const std::string number = std::to_string(i);
+                if (::pwrite(file, number.data(), number.size(), 4) != 3) return "pwrite";
+              }
+              return "";
+            }),
+            "");
 }
 
 TEST_F(TomlUserDefaultsTest, StoresEveryKindAndReadsItBack) {
