@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "config/StorebagFetcher.h"
 #include "daemon/ReportingdAgent.h"
@@ -30,6 +31,11 @@ class AgentFixture : public ::testing::Test {
     std::shared_ptr<ReportingdSession> session;  // null: refused
     explicit operator bool() const { return session != nullptr; }
   };
+
+  // Sessions and their connections hold each other until the connections end.
+  void TearDown() override {
+    for (const auto& connection : connections_) connection->invalidateNow();
+  }
 
   AgentFixture() {
     test_.clientBundle.setResource("publicKey", "der", testPublicKey());
@@ -61,6 +67,7 @@ class AgentFixture : public ::testing::Test {
         std::make_shared<FakeConnection>(SerialQueue::create("test.connection", test_.executor), user);
     client.connection->setDescription("<connection>");
     if (!entitlement.isNull()) client.connection->setEntitlement(kEntitlement, std::move(entitlement));
+    connections_.push_back(client.connection);
     if (listener_.connect(client.connection))
       client.session = std::static_pointer_cast<ReportingdSession>(client.connection->exportedObject());
     return client;
@@ -104,6 +111,7 @@ class AgentFixture : public ::testing::Test {
   FakeProcessTransaction transaction_;
   ReportingdAgent agent_{test_.configuration, fetcher_, class_, transaction_};
   FakeListener listener_;
+  std::vector<std::shared_ptr<FakeConnection>> connections_;
 };
 
 }  // namespace kyt

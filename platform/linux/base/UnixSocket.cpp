@@ -114,7 +114,7 @@ PeerCredentials UnixStream::peer() {
   peer.groups.resize(groups.size() / sizeof(gid_t));
   if (!groups.empty()) std::memcpy(peer.groups.data(), groups.data(), peer.groups.size() * sizeof(gid_t));
   const std::vector<char> label = variableOption(socket_.get(), SO_PEERSEC);
-  peer.securityLabel.assign(label.data(), ::strnlen(label.data(), label.size()));
+  if (!label.empty()) peer.securityLabel.assign(label.data(), ::strnlen(label.data(), label.size()));
   int pidfd = -1;
   size = sizeof pidfd;
   if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) == 0)
