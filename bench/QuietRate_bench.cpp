@@ -31,6 +31,17 @@ namespace {
 constexpr int kClients = 4;
 constexpr long kMessageBytes = 600;
 std::atomic<long> received{0};
+Duration workOfMessage{};
+
+// A pool that keeps its queues to itself.
+class LendsNone final : public Executor {
+ public:
+  explicit LendsNone(WorkerPool& pool) : pool_(pool) {}
+  void submit(std::shared_ptr<SerialQueue> queue) override { pool_.submit(std::move(queue)); }
+
+ private:
+  WorkerPool& pool_;
+};
 
 double processorSeconds() {
   rusage usage{};
@@ -45,6 +56,8 @@ double processorSeconds() {
   std::array<char, kMessageBytes> message{};
   timespec next{};
   clock_gettime(CLOCK_MONOTONIC, &next);
+  while (perSecond == 0)
+    if (write(descriptor, message.data(), message.size()) < 0) _exit(0);
   const long step = 1000000000 / perSecond;
   next.tv_nsec += step * client / kClients;
   for (;;) {
@@ -85,13 +98,21 @@ struct Clients {
 };
 
 // Reads until there is no more, as a connection does with edge-triggered readiness: a short read says so.
-void drain(int descriptor) {
+// False when there is more than one turn's worth.
+bool drain(int descriptor) {
   std::array<char, 65536> buffer;
-  for (;;) {
+  for (size_t bytes = 0;; bytes += buffer.size()) {
+    if (bytes >= 256 * kMessageBytes) return false;
     const ssize_t got = read(descriptor, buffer.data(), buffer.size());
-    if (got <= 0) return;
-    received.fetch_add(got / kMessageBytes, std::memory_order_relaxed);
-    if (static_cast<size_t>(got) < buffer.size()) return;
+    if (got <= 0) return true;
+    const long messages = got / kMessageBytes;
+    if (workOfMessage > Duration::zero()) {
+      const auto end = std::chrono::steady_clock::now() + workOfMessage * messages;
+      while (std::chrono::steady_clock::now() < end) {
+      }
+    }
+    received.fetch_add(messages, std::memory_order_relaxed);
+    if (static_cast<size_t>(got) < buffer.size()) return true;
   }
 }
 
@@ -120,7 +141,9 @@ void reference(long perSecond) {
     std::array<epoll_event, 16> events;
     while (!stop) {
       const int count = epoll_wait(epoll.get(), events.data(), 16, 1000);
-      for (int i = 0; i < count; ++i) drain(events[static_cast<size_t>(i)].data.fd);
+      for (int i = 0; i < count; ++i)
+        while (!drain(events[static_cast<size_t>(i)].data.fd)) {
+        }
     }
   });
   measure("epoll and read, one thread");
@@ -128,25 +151,30 @@ void reference(long perSecond) {
   reader.join();
 }
 
-void reactorAndQueues(long perSecond) {
+void turn(SerialQueue& queue, int descriptor) {
+  if (!drain(descriptor)) queue.async([&queue, descriptor] { turn(queue, descriptor); });
+}
+
+void reactorAndQueues(const char* name, long perSecond, bool lends) {
   Clients clients(perSecond);
   WorkerPoolOptions options;
   options.nameThread = beginServiceThread;
   WorkerPool pool(options);
+  LendsNone workersOnly(pool);
   auto reactor = EpollReactor::create();
   std::vector<std::shared_ptr<SerialQueue>> queues;
   std::vector<Watch> watches;
   for (Descriptor& socket : clients.sockets) {
-    auto queue = SerialQueue::create("connection", pool);
+    auto queue = SerialQueue::create("connection", lends ? static_cast<Executor&>(pool) : workersOnly);
     queues.push_back(queue);
-    watches.push_back(
-        reactor->watch(socket.get(), ready::readable | ready::edgeTriggered,
-                       [queue, fd = socket.get()](unsigned) { queue->async([fd] { drain(fd); }); }));
+    watches.push_back(reactor->watch(
+        socket.get(), ready::readable | ready::edgeTriggered,
+        [queue, fd = socket.get()](unsigned) { queue->async([&queue = *queue, fd] { turn(queue, fd); }); }));
   }
   const uint64_t wakeUps = reactor->wakeUps();
   const uint64_t workerWakeUps = pool.figures().wakeUps;
   const long first = received;
-  measure("reactor, queues, pool");
+  measure(name);
   const double messages = static_cast<double>(received - first);
   printf("  wake-ups for each message: reactor %.3f, workers %.3f\n",
          static_cast<double>(reactor->wakeUps() - wakeUps) / messages,
@@ -160,9 +188,11 @@ void reactorAndQueues(long perSecond) {
 }  // namespace kyt
 
 int main(int argc, char** argv) {
-  const long perSecond = argc > 1 ? atol(argv[1]) : 1250;  // of each client
-  kyt::reference(perSecond);
-  kyt::reactorAndQueues(perSecond);
-  kyt::reference(perSecond);
-  kyt::reactorAndQueues(perSecond);
+  const long perSecond = argc > 1 ? atol(argv[1]) : 1250;
+  if (argc > 2) kyt::workOfMessage = std::chrono::microseconds(atol(argv[2]));
+  for (int round = 0; round < 2; ++round) {
+    kyt::reference(perSecond);
+    kyt::reactorAndQueues("reactor and workers", perSecond, true);
+    kyt::reactorAndQueues("… workers only", perSecond, false);
+  }
 }
