@@ -1,11 +1,16 @@
 #include "tests/support/NetworkNamespace.h"
 
 #include <fcntl.h>
+#include <net/if.h>
 #include <sched.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <stdexcept>
+#include <thread>
 
 namespace kyt {
 namespace {
@@ -66,7 +71,23 @@ bool NetworkNamespace::connect(const std::string& interface, const std::string& 
          run("ip link set " + otherInterface + " netns " + there) &&
          other.run("ip addr add " + otherAddress + " dev " + otherInterface + " && ip link set " +
                    otherInterface + " up") &&
-         run("ip addr add " + address + " dev " + interface + " && ip link set " + interface + " up");
+         run("ip addr add " + address + " dev " + interface + " && ip link set " + interface + " up") &&
+         other.waitUntilRunning(otherInterface) && waitUntilRunning(interface);
+}
+
+bool NetworkNamespace::waitUntilRunning(const std::string& interface) const {
+  const Entered entered(*this);
+  const int probe = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  ifreq question{};
+  interface.copy(question.ifr_name, sizeof question.ifr_name - 1);
+  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  bool running = false;
+  while (!running && std::chrono::steady_clock::now() < end) {
+    running = ioctl(probe, SIOCGIFFLAGS, &question) == 0 && (question.ifr_flags & IFF_RUNNING) != 0;
+    if (!running) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
+  close(probe);
+  return running;
 }
 
 }  // namespace kyt

@@ -33,10 +33,12 @@ class NetworkNamespace {
   // Runs a shell command inside; whether it succeeded.
   bool run(const std::string& command) const;
   // A pair of virtual interfaces, one end here and one there, both up, each with its address ("10.0.0.1/24").
+  // Waits until the kernel says that both carry: it does so a little later.
   bool connect(const std::string& interface, const std::string& address, const NetworkNamespace& other,
                const std::string& otherInterface, const std::string& otherAddress) const;
 
  private:
+  [[nodiscard]] bool waitUntilRunning(const std::string& interface) const;
   int descriptor_;
 };
 

@@ -35,7 +35,7 @@ struct CurlURLSessionOptions {
   std::vector<std::string> cellularInterfaces = {"wwan*"};  // shell patterns, besides what the kernel marks
   Duration noProgressTimeout = std::chrono::seconds(60);
   Duration idleConnectionTime = std::chrono::seconds(30);  // then a session's connections close
-  size_t maxIdlePools = 1024;                              // sessions with idle connections: descriptors
+  size_t maxIdlePools = 512;                               // sessions with idle connections: descriptors
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events
   std::string sysClassNet = "/sys/class/net";
   std::string resolverFile = "/etc/resolv.conf";

@@ -137,7 +137,7 @@ void URLConnectionPool::leaveIdle() {
 
 int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {
   auto& self = *static_cast<URLConnectionPool*>(pool);
-  self.network_.watchSocket(self, socket, what);
+  self.network_.sockets().watch(self, socket, what);
   return 0;
 }
 

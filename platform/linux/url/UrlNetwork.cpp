@@ -145,6 +145,7 @@ void URLNetwork::run() {
   wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read
   wake.data.u64 = kWake;
   epoll_ctl(epoll_, EPOLL_CTL_ADD, wake_, &wake);
+  sockets_.setEpoll(epoll_);
   now_ = currentTime();
   for (;;) {
     takeCommands();
@@ -173,15 +174,8 @@ void URLNetwork::handleEvent(uint64_t which, uint32_t events) {
     routesChanged();
     return;
   }
-  Watched& watched = sockets_[which];
-  if (watched.pool != nullptr) {
-    watched.pool->socketReady(static_cast<int>(which), events);
-  } else if (watched.events != 0) {
-    // An idle connection that was left watched in the hope of its next request: the server closed it. libcurl
-    // finds that out when it looks at the connection again.
-    epoll_ctl(epoll_, EPOLL_CTL_DEL, static_cast<int>(which), nullptr);
-    watched.events = 0;
-  }
+  const int socket = static_cast<int>(which);
+  if (URLConnectionPool* pool = sockets_.poolOf(socket)) pool->socketReady(socket, events);
 }
 
 void URLNetwork::takeCommands() {
@@ -333,44 +327,9 @@ void URLNetwork::unlistIfUnused(URLSessionState& session) {
   const std::shared_ptr<URLSessionState> last = std::move(session.self);
 }
 
-void URLNetwork::socketOpened(int socket) {
-  if (sockets_.size() <= static_cast<size_t>(socket)) sockets_.resize(static_cast<size_t>(socket) + 1);
-  sockets_[static_cast<size_t>(socket)] = {nullptr, 0, true};
-}
-
 int URLNetwork::socketClosed(void* network, curl_socket_t socket) {
-  auto& self = *static_cast<URLNetwork*>(network);
-  if (static_cast<size_t>(socket) < self.sockets_.size()) self.sockets_[static_cast<size_t>(socket)] = {};
+  static_cast<URLNetwork*>(network)->sockets_.closed(socket);
   return close(socket);
-}
-
-void URLNetwork::watchSocket(URLConnectionPool& pool, int socket, int what) {
-  const auto index = static_cast<size_t>(socket);
-  if (sockets_.size() <= index) sockets_.resize(index + 1);
-  Watched& watched = sockets_[index];
-  if (what == CURL_POLL_REMOVE) {
-    watched.pool = nullptr;
-    // A connection that only waits to be used again stays watched for input, which is what its next request
-    // starts with: two system calls fewer for each request.
-    if (watched.ours && watched.events == EPOLLIN) return;
-    if (watched.events != 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
-    watched.events = 0;
-    return;
-  }
-  const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
-                          ((what & CURL_POLL_OUT) != 0 ? uint32_t{EPOLLOUT} : 0);
-  watched.pool = &pool;
-  if (watched.events == wanted) return;
-  epoll_event event{};
-  event.events = wanted;
-  event.data.u64 = index;
-  const int operation = watched.events == 0 ? EPOLL_CTL_ADD : EPOLL_CTL_MOD;
-  if (epoll_ctl(epoll_, operation, socket, &event) != 0) {
-    // A number that the resolver used again without telling: the kernel knows better.
-    const int other = errno == EEXIST ? EPOLL_CTL_MOD : EPOLL_CTL_ADD;
-    if (epoll_ctl(epoll_, other, socket, &event) != 0) return;
-  }
-  watched.events = wanted;
 }
 
 }  // namespace kyt

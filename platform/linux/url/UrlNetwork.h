@@ -23,6 +23,7 @@
 #include "platform/linux/url/RouteEvents.h"
 #include "platform/linux/url/RouteTable.h"
 #include "platform/linux/url/UrlSessionState.h"
+#include "platform/linux/url/WatchedSockets.h"
 
 namespace kyt {
 
@@ -75,9 +76,8 @@ class URLNetwork {
   [[nodiscard]] RouteTable& routes() { return routes_; }
   [[nodiscard]] CertificateStore& certificates() { return certificates_; }
   [[nodiscard]] const CurlURLSessionOptions& options() const { return options_; }
-  void socketOpened(int socket);
+  [[nodiscard]] WatchedSockets& sockets() { return sockets_; }
   static int socketClosed(void* network, curl_socket_t socket);
-  void watchSocket(URLConnectionPool& pool, int socket, int what);
   void transferEnded(URLTransfer& transfer, CURLcode code);
   void transferDeadline(URLTransfer& transfer);
   void closePool(URLSessionState& session, size_t number);
@@ -88,12 +88,6 @@ class URLNetwork {
     Kind kind;
     std::shared_ptr<URLTransfer> transfer;
     std::shared_ptr<URLSessionState> session;
-  };
-  // What the event loop knows about a socket, by number.
-  struct Watched {
-    URLConnectionPool* pool = nullptr;  // null: not libcurl's any more, or not at the moment
-    uint32_t events = 0;                // that the kernel watches; 0: none
-    bool ours = false;                  // opened by openSocket(), so that its end is told
   };
 
   void submit(Command command);
@@ -148,7 +142,7 @@ class URLNetwork {
   RouteTable routes_;
   RouteEvents routeEvents_;
   CertificateStore certificates_;
-  std::vector<Watched> sockets_;
+  WatchedSockets sockets_;
   std::vector<Command> taken_;
   LinkedList<URLSessionState> sessions_;  // that have requests or connections
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first

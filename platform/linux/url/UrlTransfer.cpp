@@ -220,7 +220,7 @@ curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockadd
   if (!interface.empty())
     (void)setsockopt(opened, SOL_SOCKET, SO_BINDTODEVICE, interface.c_str(),
                      static_cast<socklen_t>(interface.size() + 1));
-  network.socketOpened(opened);
+  network.sockets().opened(opened);
   return opened;
 }
 

@@ -1,0 +1,59 @@
+#include "platform/linux/url/WatchedSockets.h"
+
+#include <curl/curl.h>
+#include <sys/epoll.h>
+
+#include <cerrno>
+
+namespace kyt {
+
+WatchedSockets::Watched& WatchedSockets::at(int socket) {
+  const auto index = static_cast<size_t>(socket);
+  if (sockets_.size() <= index) sockets_.resize(index + 1);
+  return sockets_[index];
+}
+
+void WatchedSockets::opened(int socket) {
+  at(socket) = {nullptr, 0, true};
+}
+
+void WatchedSockets::closed(int socket) {
+  at(socket) = {};
+}
+
+URLConnectionPool* WatchedSockets::poolOf(int socket) {
+  Watched& watched = at(socket);
+  if (watched.pool == nullptr && watched.events != 0) {
+    // The server closed an idle connection. libcurl finds that out when it looks at the connection again.
+    epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
+    watched.events = 0;
+  }
+  return watched.pool;
+}
+
+void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
+  Watched& watched = at(socket);
+  if (what == CURL_POLL_REMOVE) {
+    watched.pool = nullptr;
+    if (watched.ours && watched.events == EPOLLIN) return;
+    if (watched.events != 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
+    watched.events = 0;
+    return;
+  }
+  const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
+                          ((what & CURL_POLL_OUT) != 0 ? uint32_t{EPOLLOUT} : 0);
+  watched.pool = &pool;
+  if (watched.events == wanted) return;
+  epoll_event event{};
+  event.events = wanted;
+  event.data.u64 = static_cast<uint64_t>(socket);
+  const int operation = watched.events == 0 ? EPOLL_CTL_ADD : EPOLL_CTL_MOD;
+  if (epoll_ctl(epoll_, operation, socket, &event) != 0) {
+    // A number that the resolver used again without telling: the kernel knows better.
+    const int other = errno == EEXIST ? EPOLL_CTL_MOD : EPOLL_CTL_ADD;
+    if (epoll_ctl(epoll_, other, socket, &event) != 0) return;
+  }
+  watched.events = wanted;
+}
+
+}  // namespace kyt

@@ -1,0 +1,36 @@
+// What the network thread's event loop knows about libcurl's sockets, by number: which pool each belongs to
+// and what the kernel watches it for. A connection that idles stays watched for input, which is what its next
+// request begins with, so that a request on a connection that exists costs no system call here. Network
+// thread only.
+#pragma once
+
+#include <cstdint>
+#include <vector>
+
+namespace kyt {
+
+class URLConnectionPool;
+
+class WatchedSockets {
+ public:
+  void setEpoll(int descriptor) { epoll_ = descriptor; }
+  // A socket of ours: its end will be told.
+  void opened(int socket);
+  void closed(int socket);
+  // As libcurl's socket callback says: CURL_POLL_IN, …_OUT, …_INOUT, …_REMOVE.
+  void watch(URLConnectionPool& pool, int socket, int what);
+  // The pool that waits for an event of that socket, or null; then the socket is no longer watched.
+  [[nodiscard]] URLConnectionPool* poolOf(int socket);
+
+ private:
+  struct Watched {
+    URLConnectionPool* pool = nullptr;  // null: nobody waits for it at the moment
+    uint32_t events = 0;                // that the kernel watches; 0: none
+    bool ours = false;
+  };
+  Watched& at(int socket);
+  int epoll_ = -1;
+  std::vector<Watched> sockets_;
+};
+
+}  // namespace kyt
