@@ -1,0 +1,88 @@
+// Sessions of one hierarchy on several threads, with the real back ends: what the thread sanitizer watches.
+#include <atomic>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "backends/BackendTable.h"
+#include "daemon/ReportingdAgent.h"
+#include "platform/fake/FakeListener.h"
+#include "platform/fake/FakeProcessTransaction.h"
+#include "tests/daemon/AgentFixture.h"
+
+namespace kyt {
+namespace {
+
+TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
+  const Dictionary entry{{"post_url", "https://post.example.org"}, {"event_threshold", 5}};
+  serve(releaseBag(Dictionary{{"httppost", Dictionary{{"clients", Array{entry}}}}}));
+  // The platform of the fixture, but with a deflate that several threads may use.
+  Platform& fakes = test_.platform;
+  Platform platform{fakes.limits,      fakes.counters,     fakes.log,
+                    fakes.clock,       fakes.timers,       fakes.executor,
+                    fakes.random,      fakes.userDefaults, fakes.deviceProperties,
+                    fakes.consent,     fakes.cryptography, fakes.propertyLists,
+                    fakes.json,        test_.zlib,         fakes.memory,
+                    fakes.urlSessions, fakes.clientBundle, fakes.daemonBundle};
+  Configuration configuration{platform, test_.deviceIdentity, test_.environment};
+  DefaultBackendFactory factory(configuration, backendTable(configuration));
+  ReportingdSessionClass sessionClass(configuration, factory, messageLog_);
+  ReportingdAgent agent(configuration, fetcher_, sessionClass, transaction_);
+  listener_.setDelegate(agent);
+  test_.log.setLevel(LogLevel::error);
+
+  constexpr int kThreads = 4, kRounds = 15;
+  std::atomic<bool> done{false};
+  std::jthread drain([&] {
+    while (!done) {
+      if (test_.executor.runAll() == 0) std::this_thread::yield();
+    }
+  });
+  std::atomic<int> answered{0};
+  const auto client = [&](int level) {
+    for (int round = 0; round < kRounds; ++round) {
+      auto connection =
+          std::make_shared<FakeConnection>(SerialQueue::create("test.connection", test_.executor), 1000);
+      connection->setEntitlement(kEntitlement, true);
+      if (!listener_.connect(connection)) continue;
+      Dictionary info = sessionInfoAt(level, "T", static_cast<uint32_t>(level));
+      info.set(kKYTReportingSessionInfoBatchEvent, true);
+      const auto call = [&](auto work) { connection->call(work); };
+      call([&](ClientSessionInterface& s) { s.setSessionInfo(info, std::nullopt, nullptr, round % 2 == 0); });
+      call([&](ClientSessionInterface& s) { s.startConfigWithCompletionHandler(nullptr); });
+      for (unsigned i = 0; i < 8; ++i) {
+        call([&](ClientSessionInterface& s) {
+          s.sendMessageWithDictionary(
+              Dictionary{{"Category", i}, {"Type", 1}, {"Payload", Dictionary{{"k", round}}}}, nullptr);
+        });
+        call([&](ClientSessionInterface& s) { s.updateSharedDataForKey("shared", round); });
+      }
+      call([&](ClientSessionInterface& s) {
+        s.flushMessagesWithCompletion([&](Value, std::optional<Error>) { ++answered; });
+      });
+      connection->invalidateNow();
+    }
+  };
+  test_.urlSessions.setResponder(
+      [&](const URLRequest& request) -> std::optional<FakeURLSessionFactory::Reply> {
+        FakeURLSessionFactory::Reply reply;
+        if (request.method == "GET") {
+          reply.body = signedBag(releaseBag(Dictionary{{"httppost", Dictionary{{"clients", Array{entry}}}}}),
+                                 test_.propertyLists);
+        }
+        return reply;
+      });
+  {
+    std::vector<std::jthread> threads;
+    for (int level = 0; level < kThreads; ++level) threads.emplace_back(client, level);
+  }
+  done = true;
+  drain.join();
+  EXPECT_EQ(answered, kThreads * kRounds);
+  EXPECT_EQ(agent.sessionCount(), 0U);
+  EXPECT_TRUE(agent.waitUntilSessionsHaveEnded(std::chrono::seconds(10)));
+  EXPECT_FALSE(transaction_.outOfOrder());
+}
+
+}  // namespace
+}  // namespace kyt
