@@ -61,7 +61,7 @@ class Call {
   sd_bus* bus_;
   sd_bus_message* call_ = nullptr;
   sd_bus_message* reply_ = nullptr;
-  sd_bus_error error_ = SD_BUS_ERROR_NULL;
+  sd_bus_error error_{};
 };
 
 TEST(SdBusPeer, RunsAWholeSession) {
