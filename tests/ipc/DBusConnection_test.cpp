@@ -1,0 +1,308 @@
+// Turns, time and gathering of replies, step by step, on streams in memory.
+#include "platform/ipc/DBusConnection.h"
+
+#include <gtest/gtest.h>
+
+#include "WireTestSupport.h"
+#include "platform/Entitlements.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/WorkerPool.h"
+#include "platform/fake/ManualClock.h"
+#include "platform/fake/ManualExecutor.h"
+#include "platform/fake/ManualTimers.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "platform/fake/MemoryStream.h"
+#include "platform/ipc/DBusServer.h"
+
+namespace kyt {
+namespace {
+
+constexpr int kStream = 7;
+
+class CountingSession : public ClientSessionInterface {
+ public:
+  void setSessionInfo(Dictionary, std::optional<Dictionary>, Value, bool) override { ++calls; }
+  void startConfigWithCompletionHandler(StatesReply reply) override { held.push_back(std::move(reply)); }
+  void fetchStatesWithUserInfo(std::optional<Dictionary>, StatesReply reply) override { reply(std::nullopt); }
+  void fetchDisplayURL(StringReply reply) override {
+    ++calls;
+    if (blocks) {
+      reply("early");
+      BlockingScope blocking;
+      writesWhenBlocked = writes();
+    } else {
+      reply("url");
+    }
+  }
+  void sendMessageWithDictionary(Dictionary, ObjectReply) override { ++calls; }
+  void flushMessagesWithCompletion(ResultReply) override {}
+  void finishSessionGracefully() override { ++calls; }
+  void uploadFileAtPath(String, String, std::optional<FileExtension>, SuccessReply) override {}
+  void uploadLogData(Value, SuccessErrorReply) override {}
+  void sendMessageWithSessionInfo(Dictionary, std::optional<Dictionary>, uint16_t, uint16_t,
+                                  std::optional<Dictionary>, StringReply) override {}
+  void updateSharedDataWithDictionary(Dictionary) override {}
+  void updateSharedDataForKey(String, Value) override {}
+  void setDigestKey(Data, int32_t) override {}
+
+  int calls = 0;
+  bool blocks = false;
+  size_t writesWhenBlocked = 0;
+  std::function<size_t()> writes;
+  std::vector<StatesReply> held;
+};
+
+class NoEntitlements final : public Entitlements {
+ public:
+  Value valueFor(const PeerCredentials&, std::string_view) override { return {}; }
+};
+
+class Connected : public ::testing::Test, public ListenerDelegate {
+ protected:
+  Connected() {
+    auto acceptor = std::make_unique<MemoryAcceptor>();
+    acceptor_ = acceptor.get();
+    server_ = std::make_unique<DBusServer>(
+        DBusServerServices{limits_, counters_, log_, clock_, timers_, executor_, reactor_, entitlements_,
+                           "00112233445566778899aabbccddeeff"},
+        std::move(acceptor));
+    server_->setDelegate(*this);
+    server_->resume();
+    session_->writes = [this] { return pipe_->writes; };
+    pipe_->credentials.uid = 1000;
+    acceptor_->waiting.push_back(std::make_unique<MemoryStream>(pipe_, kStream));
+    EXPECT_TRUE(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+    executor_.runAll();
+  }
+  ~Connected() override {
+    server_->invalidateConnections();
+    executor_.runAll();
+    EXPECT_EQ(server_->connectionCount(), 0u);
+    EXPECT_TRUE(pipe_->closed);
+  }
+  bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
+    connection->setExportedObject(session_);
+    connection->setInterruptionHandler([this] { ++interruptions_; });
+    connection->setInvalidationHandler([this] { ++invalidations_; });
+    connection->resume();
+    connection_ = connection;
+    return true;
+  }
+  void shakeHands() {
+    say(ClientHandshake::opening(1000));
+    executor_.runAll();
+    EXPECT_NE(pipe_->fromServer.find("AGREE_UNIX_FD\r\n"), std::string::npos);
+    pipe_->fromServer.clear();
+    pipe_->writes = pipe_->reads = 0;
+  }
+  void say(std::string_view bytes) {
+    pipe_->toServer.append(bytes);
+    EXPECT_TRUE(reactor_.report(kStream, ready::readable));
+  }
+  static std::string displayURLCalls(unsigned count) {
+    std::string bytes;
+    MessageWriter writer(bytes);
+    for (unsigned i = 1; i <= count; ++i) {
+      writer.beginCall(i, {.member = "FetchDisplayURL"});
+      EXPECT_TRUE(writer.end());
+    }
+    return bytes;
+  }
+
+  Limits limits_;
+  Counters counters_;
+  MemoryLogSink sink_;
+  Log log_{sink_, LogLevel::debug};
+  ManualClock clock_;
+  ManualTimers timers_{clock_};
+  ManualExecutor executor_;
+  ManualReactor reactor_;
+  NoEntitlements entitlements_;
+  std::shared_ptr<MemoryPipe> pipe_ = std::make_shared<MemoryPipe>();
+  std::shared_ptr<CountingSession> session_ = std::make_shared<CountingSession>();
+  std::shared_ptr<Connection> connection_;
+  MemoryAcceptor* acceptor_ = nullptr;
+  std::unique_ptr<DBusServer> server_;
+  int interruptions_ = 0, invalidations_ = 0;
+};
+
+using DBusConnectionTest = Connected;
+
+TEST_F(DBusConnectionTest, EndsAHandshakeThatTakesThirtySeconds) {
+  say(std::string("\0AUTH", 5));
+  executor_.runAll();
+  timers_.advance(std::chrono::milliseconds(29900));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 0);
+  timers_.advance(std::chrono::milliseconds(200));
+  executor_.runAll();
+  EXPECT_EQ(interruptions_, 1);
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_EQ(counters_.value(Reason::handshakeTimedOut), 1u);
+  EXPECT_TRUE(pipe_->closed);
+}
+
+TEST_F(DBusConnectionTest, HasNoTimerOnceTheHandshakeIsDone) {
+  EXPECT_EQ(timers_.pending(), 1u);
+  shakeHands();
+  EXPECT_EQ(timers_.pending(), 0u);
+}
+
+TEST_F(DBusConnectionTest, AnswersThePipelinedCallsOfATurnInOneWrite) {
+  shakeHands();
+  say(displayURLCalls(100));
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 100);
+  EXPECT_EQ(pipe_->writes, 1u);
+  EXPECT_EQ(pipe_->reads, 1u) << "a read that does not fill the buffer is the last";
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, WritesWhatItGatheredBeforeAnOperationBlocks) {
+  shakeHands();
+  session_->blocks = true;
+  say(displayURLCalls(1));
+  executor_.runAll();
+  EXPECT_EQ(session_->writesWhenBlocked, 1u);
+}
+
+TEST_F(DBusConnectionTest, HandsItsWorkerBackAfter256Calls) {
+  shakeHands();
+  say(displayURLCalls(600));
+  unsigned turns = 0;
+  std::vector<int> callsAfterTurn;
+  while (executor_.runOne()) {
+    ++turns;
+    callsAfterTurn.push_back(session_->calls);
+    EXPECT_EQ(reactor_.waitsFor(kStream), session_->calls < 600 ? 0u : ready::readable);
+  }
+  EXPECT_EQ(callsAfterTurn, (std::vector<int>{256, 512, 600}));
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, HandsItsWorkerBackAfterAMebibyte) {
+  shakeHands();
+  std::string bytes;
+  MessageWriter writer(bytes);
+  for (uint32_t i = 1; i <= 40; ++i) {
+    writer.beginCall(i, {.member = "SendMessageWithDictionary", .signature = "a{sv}", .expectsReply = false});
+    writer.writeDictionary({{"text", std::string(60000, 'x')}});
+    ASSERT_TRUE(writer.end());
+  }
+  say(bytes);
+  ASSERT_TRUE(executor_.runOne());
+  EXPECT_GE(session_->calls, 15);
+  EXPECT_LE(session_->calls, 18);
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 40);
+}
+
+TEST_F(DBusConnectionTest, RepliesFromOutsideATurnLeaveAtOnce) {
+  shakeHands();
+  std::string bytes;
+  MessageWriter writer(bytes);
+  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
+  ASSERT_TRUE(writer.end());
+  say(bytes);
+  executor_.runAll();
+  ASSERT_EQ(session_->held.size(), 1u);
+  EXPECT_EQ(pipe_->writes, 0u);
+  session_->held[0](Array{"a"});
+  EXPECT_EQ(pipe_->writes, 1u);
+  session_->held[0](Array{"again"});
+  EXPECT_EQ(pipe_->writes, 1u) << "a second answer is none";
+}
+
+TEST_F(DBusConnectionTest, AnswersThatComeAfterTheEndAreDropped) {
+  shakeHands();
+  std::string bytes;
+  MessageWriter writer(bytes);
+  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
+  ASSERT_TRUE(writer.end());
+  say(bytes);
+  pipe_->ended = true;
+  executor_.runAll();
+  EXPECT_TRUE(reactor_.report(kStream, ready::readable | ready::ended));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_EQ(interruptions_, 0);
+  EXPECT_TRUE(pipe_->closed);
+  session_->held[0](Array{"a"});
+  session_->held.clear();
+  EXPECT_TRUE(pipe_->fromServer.empty());
+}
+
+TEST_F(DBusConnectionTest, WaitsForRoomAndGoesOnWhereItStopped) {
+  shakeHands();
+  pipe_->room = 100;
+  say(displayURLCalls(50));
+  executor_.runAll();
+  EXPECT_EQ(pipe_->fromServer.size(), 100u);
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable | ready::writable);
+  std::string all;
+  while (reactor_.waitsFor(kStream) == (ready::readable | ready::writable)) {
+    all += std::exchange(pipe_->fromServer, std::string());
+    ASSERT_TRUE(reactor_.report(kStream, ready::writable));
+  }
+  all += pipe_->fromServer;
+  size_t at = 0;
+  for (uint32_t i = 1; i <= 50; ++i) {
+    Message message;
+    const Frame frame = test::frame(std::string_view(all).substr(at), message);
+    ASSERT_EQ(frame.status, FrameStatus::complete);
+    EXPECT_EQ(message.replySerial, i);
+    at += frame.size;
+  }
+  EXPECT_EQ(at, all.size());
+}
+
+TEST_F(DBusConnectionTest, HandlesWhatWasReadBeforeItFinishes) {
+  shakeHands();
+  say(displayURLCalls(400));
+  ASSERT_TRUE(executor_.runOne());
+  connection_->finish();
+  pipe_->toServer += displayURLCalls(5);
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 400);
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_TRUE(pipe_->closed);
+}
+
+TEST_F(DBusConnectionTest, EveryTruncationOfAConversationEndsItInTheRightWay) {
+  for (const std::string& call : test::everyCall()) {
+    for (const size_t cut : {size_t{1}, size_t{15}, size_t{17}, call.size() - 1, call.size()}) {
+      auto pipe = std::make_shared<MemoryPipe>();
+      pipe->credentials.uid = 1000;
+      pipe->toServer = ClientHandshake::opening(1000) + call.substr(0, cut);
+      pipe->ended = true;
+      pipe->passed = 2;
+      const int interruptions = interruptions_, invalidations = invalidations_;
+      acceptor_->waiting.push_back(std::make_unique<MemoryStream>(pipe, 8));
+      ASSERT_TRUE(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+      executor_.runAll();
+      while (reactor_.report(8, ready::readable)) executor_.runAll();
+      EXPECT_EQ(invalidations_, invalidations + 1);
+      EXPECT_TRUE(pipe->closed);
+      // The descriptors came with the handshake, before they were agreed on, so an upload claims what is not
+      // there.
+      const bool whole = cut == call.size() && call.find("UploadFileAtPath") == std::string::npos;
+      EXPECT_EQ(interruptions_, interruptions + (whole ? 0 : 1)) << cut;
+    }
+  }
+}
+
+TEST_F(DBusConnectionTest, TriesAgainToAcceptAfterAPauseWhenNoDescriptorsAreLeft) {
+  acceptor_->whenEmpty = AcceptStatus::exhausted;
+  ASSERT_TRUE(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+  executor_.runAll();
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), 0u) << "it must not spin";
+  EXPECT_EQ(counters_.value(Reason::tooManyConnections), 1u);
+  acceptor_->whenEmpty = AcceptStatus::wouldBlock;
+  timers_.advance(std::chrono::milliseconds(100));
+  executor_.runAll();
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
+}
+
+}  // namespace
+}  // namespace kyt
