@@ -14,12 +14,13 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, bool droppable) {
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return Sent::closed;
-    const size_t before = pending_.size();
+    std::string& queue = open_ ? pending_ : early_;
+    const size_t before = queue.size();
     if (++lastSerial_ == 0) ++lastSerial_;
-    MessageWriter writer(pending_);
+    MessageWriter writer(queue);
     if (!build(writer, lastSerial_)) return Sent::refused;
-    if (droppable && pending_.size() - written_ > maxQueuedBytes_) {
-      pending_.resize(before);
+    if (droppable && waitingBytes() > maxQueuedBytes_) {
+      queue.resize(before);
       return Sent::queueFull;
     }
     event = queued();
@@ -28,7 +29,7 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, bool droppable) {
   return Sent::yes;
 }
 
-void ConnectionOutput::sendRaw(std::string_view bytes) {
+void ConnectionOutput::sendHandshake(std::string_view bytes) {
   Event event = Event::none;
   {
     MutexLock lock(mutex_);
@@ -39,10 +40,22 @@ void ConnectionOutput::sendRaw(std::string_view bytes) {
   tell(event);
 }
 
+void ConnectionOutput::open() {
+  Event event = Event::none;
+  {
+    MutexLock lock(mutex_);
+    open_ = true;
+    if (stream_ == nullptr || dead_ || early_.empty()) return;
+    pending_.append(std::exchange(early_, std::string()));
+    event = queued();
+  }
+  tell(event);
+}
+
 ConnectionOutput::Event ConnectionOutput::queued() {
   Event event = Event::none;
   if (!waiting_ && (!held_ || pending_.size() - written_ >= kMostHeldBytes)) event = flush();
-  const size_t left = pending_.size() - written_;
+  const size_t left = waitingBytes();
   if (event == Event::broken || left <= maxQueuedBytes_) return event;
   if (left > 2 * maxQueuedBytes_) {
     dead_ = true;

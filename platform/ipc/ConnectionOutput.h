@@ -44,8 +44,9 @@ class ConnectionOutput {
     queueFull,  // `droppable`, and it would have passed the limit
   };
   Sent send(Builder build, bool droppable = false);
-  // Bytes that are no message: the handshake's.
-  void sendRaw(std::string_view bytes);
+  // The handshake's answers, which come before every message: those that are sent earlier wait for open().
+  void sendHandshake(std::string_view bytes);
+  void open();
 
   void hold();
   void release();  // and writes
@@ -69,6 +70,9 @@ class ConnectionOutput {
   };
   Event flush() REQUIRES(mutex_);
   Event queued() REQUIRES(mutex_);
+  [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) {
+    return pending_.size() - written_ + early_.size();
+  }
   void tell(Event event);
 
   mutable Mutex mutex_;
@@ -76,6 +80,8 @@ class ConnectionOutput {
   const std::weak_ptr<Observer> observer_;
   const uint64_t maxQueuedBytes_;
   std::string pending_ GUARDED_BY(mutex_);
+  std::string early_ GUARDED_BY(mutex_);  // messages that wait for the handshake's end
+  bool open_ GUARDED_BY(mutex_) = false;
   size_t written_ GUARDED_BY(mutex_) = 0;  // of pending_
   uint32_t lastSerial_ GUARDED_BY(mutex_) = 0;
   bool held_ GUARDED_BY(mutex_) = false;

@@ -165,7 +165,7 @@ DBusConnection::Step DBusConnection::handleBytes(std::span<const std::byte> byte
 DBusConnection::Step DBusConnection::handleHandshake(std::span<const std::byte> bytes, size_t& consumed) {
   std::string answers;
   const ServerHandshake::Status status = handshake_->feed(bytes, consumed, answers);
-  if (!answers.empty()) output_->sendRaw(answers);
+  if (!answers.empty()) output_->sendHandshake(answers);
   switch (status) {
     case ServerHandshake::Status::goingOn:
       break;
@@ -175,6 +175,7 @@ DBusConnection::Step DBusConnection::handleHandshake(std::span<const std::byte> 
       descriptorsAgreed_ = handshake_->descriptorsAgreed();
       handshake_.reset();
       handshakeTimer_.cancel();
+      output_->open();
       break;
   }
   return Step::more;

@@ -149,6 +149,20 @@ TEST_F(DBusConnectionTest, HasNoTimerOnceTheHandshakeIsDone) {
   EXPECT_EQ(timers_.pending(), 0u);
 }
 
+TEST_F(DBusConnectionTest, MessagesToAClientWaitForTheEndOfItsHandshake) {
+  EXPECT_FALSE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 1, 2, std::nullopt));
+  executor_.runAll();
+  EXPECT_TRUE(pipe_->fromServer.empty());
+  say(ClientHandshake::opening(1000));
+  executor_.runAll();
+  const std::string& said = pipe_->fromServer;
+  EXPECT_EQ(said.substr(0, 3), "OK ");
+  Message message;
+  const size_t start = said.find("AGREE_UNIX_FD\r\n") + 15;
+  ASSERT_EQ(test::frame(std::string_view(said).substr(start), message).status, FrameStatus::complete);
+  EXPECT_EQ(message.member, "SendMessageToClient");
+}
+
 TEST_F(DBusConnectionTest, AnswersThePipelinedCallsOfATurnInOneWrite) {
   shakeHands();
   say(displayURLCalls(100));
