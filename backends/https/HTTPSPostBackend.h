@@ -119,6 +119,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
 
   // The batch. Those that say so run on the state queue.
   [[nodiscard]] int32_t countOnQueue(int32_t method) const;
+  void forgetSizesOnQueue();
   void appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes);
   void countDroppedByLimit() const;
   [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records);
@@ -165,6 +166,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   std::optional<Array> batchedEvents_;
   std::vector<std::pair<int32_t, int32_t>> eventMethodCounts_;  // method, records of it in the batch; sorted
   uint64_t batchedBytes_ = 0;  // estimate of what the batch holds, for the limit alone
+  // The size that the health report shows, of so many records at the beginning of the batch.
+  mutable size_t sizedRecords_ = 0;
+  mutable uint64_t sizeOfRecords_ = 0;
 };
 
 }  // namespace kyt

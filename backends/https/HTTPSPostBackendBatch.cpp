@@ -127,6 +127,7 @@ HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records)
   batchedEvents_.reset();
   eventMethodCounts_.clear();
   batchedBytes_ = 0;
+  forgetSizesOnQueue();
   return enabled ? BatchTaking::taken : BatchTaking::discarded;
 }
 
@@ -206,19 +207,27 @@ void HTTPSPostBackend::setCorrelatedSessionID(const String& sessionID) {
   stateQueue().sync([&] {
     combinedSessionIDString_ = sessionID;
     if (!batchedEvents_) return;
+    forgetSizesOnQueue();
     Value* values = batchedEvents_->mutableBegin();
     for (size_t i = 0; i < batchedEvents_->size(); ++i)
       values[i].mutableDictionary()->set("_sessionID", Value(sessionID));
   });
 }
 
+// Every session's end asks every other session's back ends, so records that were sized before are not sized
+// again.
 uint64_t HTTPSPostBackend::batchedEventsSize() const {
   return stateQueue().sync([this] {
-    uint64_t size = 0;
-    if (batchedEvents_)
-      for (const Value& record : *batchedEvents_) size += objectSizeEstimate(record, platform_.memory);
-    return size;
+    const size_t count = batchedEvents_ ? batchedEvents_->size() : 0;
+    for (; sizedRecords_ < count; ++sizedRecords_)
+      sizeOfRecords_ += objectSizeEstimate((*batchedEvents_)[sizedRecords_], platform_.memory);
+    return sizeOfRecords_;
   });
+}
+
+void HTTPSPostBackend::forgetSizesOnQueue() {
+  sizedRecords_ = 0;
+  sizeOfRecords_ = 0;
 }
 
 }  // namespace kyt

@@ -331,6 +331,16 @@ TEST_F(HTTPSPostBackendBatch, ReportsTheSizeOfItsRecords) {
   EXPECT_EQ(backend().batchedEventsSize(), 0u);
 }
 
+TEST_F(HTTPSPostBackendBatch, ItsSizeFollowsANewCombinedSessionID) {
+  inState(kBackendStateHeld);
+  send(5);
+  send(5);
+  backend().setCorrelatedSessionID("short");
+  const uint64_t before = backend().batchedEventsSize();
+  backend().setCorrelatedSessionID(std::string(200, 'x'));
+  EXPECT_GE(backend().batchedEventsSize(), before + 2 * 200);
+}
+
 TEST_F(HTTPSPostBackendBatch, PastItsLimitDropsNewEventsAndSaysSoOnceAMinute) {
   platform_.limits.maxBatchBytes = 20000;
   inState(kBackendStateHeld);
