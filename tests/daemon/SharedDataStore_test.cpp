@@ -1,0 +1,80 @@
+#include "daemon/SharedDataStore.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+namespace kyt {
+namespace {
+
+constexpr uint32_t kOne = 1, kTwo = 2;
+
+TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
+  SharedDataStore store(10000);
+  EXPECT_FALSE(store.dictionary("T"));
+  store.removeObject("T", "k");
+  store.removeToken("T");
+  EXPECT_EQ(store.bytesOfUser(kOne), 0U);
+}
+
+TEST(SharedDataStore, AnEmptyUpdateMakesAnEmptyDictionary) {
+  SharedDataStore store(10000);
+  EXPECT_TRUE(store.update("T", Dictionary(), kOne));
+  EXPECT_EQ(store.dictionary("T"), Dictionary());
+}
+
+TEST(SharedDataStore, ChargesAValueToWhoWroteItLast) {
+  SharedDataStore store(10000);
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
+  const uint64_t before = store.bytesOfUser(kOne);
+  EXPECT_GE(before, 1000U);
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(500, 'y')}}, kTwo));
+  EXPECT_LT(store.bytesOfUser(kOne), before - 900);
+  EXPECT_GE(store.bytesOfUser(kTwo), 500U);
+}
+
+TEST(SharedDataStore, ChargesWhatContainersHold) {
+  SharedDataStore store(100000);
+  EXPECT_TRUE(store.update(
+      "T", Dictionary{{"k", Array{std::string(100, 'x'), Dictionary{{"n", Data(std::string(200, 'd'))}}}}},
+      kOne));
+  EXPECT_GE(store.bytesOfUser(kOne), 300U);
+}
+
+TEST(SharedDataStore, AUserMayReplaceAValueAtTheLimit) {
+  SharedDataStore store(1500);
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(900, 'x')}}, kOne));
+  EXPECT_FALSE(store.update("T", Dictionary{{"l", std::string(900, 'x')}}, kOne));
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(901, 'z')}}, kOne));
+  EXPECT_EQ(store.dictionary("T")->size(), 1U);
+  EXPECT_TRUE(store.update("T", Dictionary{{"l", std::string(900, 'x')}}, kTwo)) << "another user's limit";
+}
+
+TEST(SharedDataStore, ARefusedUpdateMakesNoToken) {
+  SharedDataStore store(300);
+  EXPECT_FALSE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
+  EXPECT_FALSE(store.dictionary("T"));
+  EXPECT_EQ(store.bytesOfUser(kOne), 0U);
+}
+
+TEST(SharedDataStore, ManyEmptyEntriesPassTheLimitToo) {
+  SharedDataStore store(10000);
+  int accepted = 0;
+  while (accepted < 1000 && store.update("T", Dictionary{{std::to_string(accepted), 0}}, kOne)) ++accepted;
+  EXPECT_LT(accepted, 100);
+}
+
+TEST(SharedDataStore, WhatIsRemovedIsChargedNoMore) {
+  SharedDataStore store(10000);
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", 1}, {"l", std::string(800, 'x')}}, kOne));
+  store.removeObject("T", "l");
+  store.removeObject("T", "absent");
+  EXPECT_EQ(store.dictionary("T"), (Dictionary{{"k", 1}}));
+  EXPECT_LT(store.bytesOfUser(kOne), 800U);
+  store.removeToken("T");
+  EXPECT_EQ(store.bytesOfUser(kOne), 0U);
+  EXPECT_FALSE(store.dictionary("T"));
+}
+
+}  // namespace
+}  // namespace kyt
