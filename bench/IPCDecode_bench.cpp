@@ -9,8 +9,19 @@
 #include <vector>
 
 #include "bench/Corpus.h"
+#include "platform/Counters.h"
+#include "platform/Entitlements.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
 #include "platform/Value.h"
+#include "platform/fake/ManualClock.h"
+#include "platform/fake/ManualExecutor.h"
+#include "platform/fake/ManualTimers.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "platform/fake/MemoryStream.h"
 #include "platform/ipc/BodyReader.h"
+#include "platform/ipc/DBusServer.h"
+#include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageReader.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/ipc/WireText.h"
@@ -181,6 +192,81 @@ void FlatDecodeOfEventCall(benchmark::State& state) {
 }
 BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ObjectSink);
 BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ViewSink);
+
+// The server's whole turn on a stream in memory, for each call: everything but the system's reads.
+class CountingSession final : public ClientSessionInterface {
+ public:
+  void setSessionInfo(Dictionary, std::optional<Dictionary>, Value, bool) override {}
+  void startConfigWithCompletionHandler(StatesReply) override {}
+  void fetchStatesWithUserInfo(std::optional<Dictionary>, StatesReply) override {}
+  void fetchDisplayURL(StringReply) override {}
+  void sendMessageWithDictionary(Dictionary message, ObjectReply) override { entries += message.size(); }
+  void flushMessagesWithCompletion(ResultReply) override {}
+  void finishSessionGracefully() override {}
+  void uploadFileAtPath(String, String, std::optional<FileExtension>, SuccessReply) override {}
+  void uploadLogData(Value, SuccessErrorReply) override {}
+  void sendMessageWithSessionInfo(Dictionary, std::optional<Dictionary>, uint16_t, uint16_t,
+                                  std::optional<Dictionary>, StringReply) override {}
+  void updateSharedDataWithDictionary(Dictionary) override {}
+  void updateSharedDataForKey(String, Value) override {}
+  void setDigestKey(Data, int32_t) override {}
+  size_t entries = 0;
+};
+
+class NoEntitlements final : public Entitlements {
+ public:
+  Value valueFor(const PeerCredentials&, std::string_view) override { return {}; }
+};
+
+class Delegate final : public ListenerDelegate {
+ public:
+  bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
+    connection->setExportedObject(session);
+    connection->resume();
+    return true;
+  }
+  std::shared_ptr<CountingSession> session = std::make_shared<CountingSession>();
+};
+
+void ServeEventCall(benchmark::State& state) {
+  const Limits limits;
+  Counters counters;
+  MemoryLogSink sink;
+  Log log(sink);
+  ManualClock clock;
+  ManualTimers timers(clock);
+  ManualExecutor executor;
+  ManualReactor reactor;
+  NoEntitlements entitlements;
+  Delegate delegate;
+  auto pipe = std::make_shared<MemoryPipe>();
+  auto acceptor = std::make_unique<MemoryAcceptor>();
+  acceptor->waiting.push_back(std::make_unique<MemoryStream>(pipe, 7));
+  DBusServer server(
+      {limits, counters, log, clock, timers, executor, reactor, entitlements, std::string(32, 'f')},
+      std::move(acceptor));
+  server.setDelegate(delegate);
+  server.resume();
+  reactor.report(MemoryAcceptor::kDescriptor, ready::readable);
+  executor.runAll();
+  pipe->toServer = ClientHandshake::opening(0);
+  reactor.report(7, ready::readable);
+  executor.runAll();
+  std::string batch;
+  constexpr int kBatch = 128;
+  for (int i = 0; i < kBatch; ++i) batch += calls()[static_cast<size_t>(i)];
+  int left = 0;
+  for (auto _ : state) {
+    if (left-- == 0) {
+      left = kBatch - 1;
+      pipe->toServer = batch;
+      reactor.report(7, ready::readable);
+      executor.runAll();
+    }
+  }
+  if (delegate.session->entries == 0) state.SkipWithError("nothing was served");
+}
+BENCHMARK(ServeEventCall);
 
 void ReadHeaderOfEventCall(benchmark::State& state) {
   size_t next = 0;

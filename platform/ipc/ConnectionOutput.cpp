@@ -92,7 +92,7 @@ ConnectionOutput::Event ConnectionOutput::flush() {
   }
   pending_ = std::string();  // an idle connection holds no buffer
   written_ = 0;
-  const bool tellDrained = std::exchange(paused_, false) || (finishing_ && waiting_);
+  const bool tellDrained = paused_.exchange(false) || (finishing_ && waiting_);
   waiting_ = false;
   return tellDrained ? Event::drained : Event::none;
 }
@@ -152,11 +152,6 @@ void ConnectionOutput::writable() {
     if (stream_ != nullptr && !dead_ && waiting_) event = flush();
   }
   tell(event);
-}
-
-bool ConnectionOutput::paused() const {
-  MutexLock lock(mutex_);
-  return paused_;
 }
 
 bool ConnectionOutput::finish() {

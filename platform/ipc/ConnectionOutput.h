@@ -7,6 +7,7 @@
 // never blocks.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -51,7 +52,9 @@ class ConnectionOutput {
   void hold();
   void release();  // and writes
   void writable();
-  [[nodiscard]] bool paused() const;
+  [[nodiscard]] bool paused() const {
+    return paused_.load(std::memory_order_relaxed);
+  }  // asked after every call
   // Whether everything is written; otherwise outputDrained() follows when it is, or outputBroken().
   [[nodiscard]] bool finish();
   // The stream is not touched any more when this returns.
@@ -86,7 +89,7 @@ class ConnectionOutput {
   uint32_t lastSerial_ GUARDED_BY(mutex_) = 0;
   bool held_ GUARDED_BY(mutex_) = false;
   bool waiting_ GUARDED_BY(mutex_) = false;  // for room
-  bool paused_ GUARDED_BY(mutex_) = false;
+  std::atomic<bool> paused_{false};          // changes under the mutex
   bool finishing_ GUARDED_BY(mutex_) = false;
   bool dead_ GUARDED_BY(mutex_) = false;  // broken or overflowed: nothing is sent any more
 };

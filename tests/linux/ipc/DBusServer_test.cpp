@@ -2,12 +2,24 @@
 #include "platform/ipc/DBusServer.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <sys/resource.h>
 
 #include <thread>
 
 #include "ServerFixture.h"
 #include "tests/ipc/WireTestSupport.h"
+#include "tests/support/ChildProcess.h"
+
+// Sanitizers bring their own allocators, whose figures say nothing.
+#if defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+#define KYT_HAS_SANITIZER 1
+#endif
+#endif
+#if !defined(KYT_HAS_SANITIZER)
+#define KYT_HAS_SANITIZER 0
+#endif
 
 namespace kyt {
 namespace {
@@ -433,6 +445,39 @@ TEST(DBusServer, DescriptorsComeBackAfterThousandsOfConnections) {
   EXPECT_TRUE(eventually([&] { return test::openDescriptors() == before; }));
 }
 
+#if !KYT_HAS_SANITIZER
+TEST(DBusServer, IdleConnectionsAreSmallAndTheirMemoryComesBack) {
+  Server server;
+  server.keepsNothing = true;
+  constexpr size_t kConnections = 400;
+  std::vector<std::unique_ptr<PlainClient>> clients;
+  const auto open = [&] {
+    for (size_t i = 0; i < kConnections; ++i) {
+      clients.push_back(std::make_unique<PlainClient>(server.path));
+      ASSERT_TRUE(clients.back()->shakeHands());
+      clients.back()->call("FetchDisplayURL");
+      ASSERT_TRUE(clients.back()->receive());
+    }
+  };
+  const auto close = [&] {
+    clients.clear();
+    EXPECT_TRUE(eventually([&] { return server.listener->connectionCount() == 0; }));
+  };
+  open();  // so that tables and pools have grown
+  close();
+  const size_t before = ::mallinfo2().uordblks;
+  open();
+  const size_t during = ::mallinfo2().uordblks;
+  size_t ofClients = 0;
+  for (const auto& client : clients) ofClients += sizeof(PlainClient) + client->received().capacity();
+  EXPECT_LT((during - before - ofClients) / kConnections, 3000u)
+      << "bytes of the server and the session for each";
+  close();
+  // Read buffers stay for the next turns, four at most, and each worker keeps a little.
+  EXPECT_TRUE(eventually([&] { return ::mallinfo2().uordblks < before + 4 * ReadBuffers::kBytes + 30000; }));
+}
+#endif
+
 TEST(DBusServer, GoesOnServingWhenThereAreNoDescriptorsLeft) {
   Server server;
   PlainClient first(server.path);
@@ -615,7 +660,35 @@ TEST(UnixSocketAcceptor, AdoptsOnlyAListeningUnixSocket) {
   const PeerCredentials peer = stream->peer();
   EXPECT_EQ(peer.pid, ::getpid());
   EXPECT_EQ(peer.uid, ::getuid());
+  std::vector<gid_t> groups(static_cast<size_t>(::getgroups(0, nullptr)));
+  ASSERT_GE(::getgroups(static_cast<int>(groups.size()), groups.data()), 0);
+  EXPECT_EQ(peer.groups, groups);
   EXPECT_EQ(stream->peerExecutable(), std::filesystem::read_symlink("/proc/self/exe").string());
+}
+
+// What a service manager does before it starts the daemon: socket 3, and the variables that say so.
+std::string adoptInChild(int socket, const std::string& count, bool ours) {
+  return inChildProcess([&]() -> std::string {
+    if (::dup2(socket, 3) != 3) return "dup2 failed";
+    ::setenv("LISTEN_FDS", count.c_str(), 1);
+    ::setenv("LISTEN_PID", std::to_string(ours ? ::getpid() : 1).c_str(), 1);
+    auto adopted = UnixSocketAcceptor::adoptActivated();
+    if (const Error* error = std::get_if<Error>(&adopted)) return error->localizedDescription;
+    if (std::get<0>(adopted) == nullptr) return "none";
+    if (::getenv("LISTEN_FDS") != nullptr) return "the variables are still there";
+    if ((::fcntl(3, F_GETFD) & FD_CLOEXEC) == 0) return "not closed on exec";
+    return (::fcntl(3, F_GETFL) & O_NONBLOCK) != 0 ? "adopted" : "it blocks";
+  });
+}
+
+TEST(UnixSocketAcceptor, AdoptsTheSocketOfTheServiceManager) {
+  const std::string path = "/tmp/kyt-ipc-activated-" + std::to_string(::getpid());
+  auto bound = UnixSocketAcceptor::bindAt(path);
+  const int socket = std::get<std::unique_ptr<UnixSocketAcceptor>>(bound)->descriptor();
+  EXPECT_EQ(adoptInChild(socket, "1", true), "adopted");
+  EXPECT_EQ(adoptInChild(socket, "1", false), "none") << "meant for another process";
+  EXPECT_NE(adoptInChild(socket, "2", true).find("passed 2 sockets"), std::string::npos);
+  EXPECT_NE(adoptInChild(2, "1", true).find("no listening Unix stream socket"), std::string::npos);
 }
 
 }  // namespace
