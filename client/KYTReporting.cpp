@@ -70,23 +70,29 @@ KYTReporting::~KYTReporting() {
   implementation_->session->close();
 }
 
+void KYTReporting::enqueue(std::unique_ptr<client::Command> command) {
+  // Held here: the command's completion may destroy this object before the call below has returned.
+  const std::shared_ptr<client::Session> session = implementation_->session;
+  session->enqueueCommand(std::move(command));
+}
+
 void KYTReporting::startConfiguration(StatesCompletion completion) {
   auto command = std::make_unique<Command>(Kind::startConfiguration);
   command->statesCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion) {
   auto command = std::make_unique<Command>(Kind::fetchStates);
   command->dictionary = std::move(userInfo);
   command->statesCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::fetchDisplayURL(TextCompletion completion) {
   auto command = std::make_unique<Command>(Kind::fetchDisplayURL);
   command->textCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 bool KYTReporting::sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag) {
@@ -101,33 +107,33 @@ void KYTReporting::sendMessage(uint16_t category, uint16_t type, Dictionary payl
   command->flag = flag;
   command->dictionary = std::move(payload);
   command->objectCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::flush(ObjectCompletion completion) {
   auto command = std::make_unique<Command>(Kind::flush);
   command->objectCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::updateSharedData(Dictionary entries) {
   auto command = std::make_unique<Command>(Kind::updateSharedData);
   command->dictionary = std::move(entries);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::updateSharedData(String key, Value value) {
   auto command = std::make_unique<Command>(Kind::updateSharedDataForKey);
   command->text = std::move(key);
   command->value = std::move(value);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::setDigestKey(Data key, int32_t algorithm) {
   auto command = std::make_unique<Command>(Kind::setDigestKey);
   command->data = std::move(key);
   command->algorithm = algorithm;
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::uploadFile(const std::string& path, SuccessCompletion completion) {
@@ -141,14 +147,14 @@ void KYTReporting::uploadFile(const std::string& path, SuccessCompletion complet
   }
   command->text = fileURL(absolute);
   command->descriptors = {opened.file, opened.folder};
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 void KYTReporting::uploadLogData(Array logData, SuccessCompletion completion) {
   auto command = std::make_unique<Command>(Kind::uploadLogData);
   command->array = std::move(logData);
   command->successCompletion = std::move(completion);
-  implementation_->session->enqueueCommand(std::move(command));
+  enqueue(std::move(command));
 }
 
 bool KYTReporting::finish(std::chrono::milliseconds timeout) {

@@ -29,6 +29,11 @@ endif()
 if(KYT_SANITIZER)
   target_compile_options(kyt_options INTERFACE -fsanitize=${KYT_SANITIZER} -fno-sanitize-recover=all)
   target_link_options(kyt_options INTERFACE -fsanitize=${KYT_SANITIZER})
+  if(KYT_SANITIZER MATCHES "undefined")
+    # The dynamic-type check probes memory through a pipe, and so reports objects as invalid in the tests that run out of
+    # descriptors on purpose.
+    target_compile_options(kyt_options INTERFACE -fno-sanitize=vptr)
+  endif()
   if(KYT_FUZZ)
     target_compile_options(kyt_options INTERFACE -fsanitize=fuzzer-no-link)
     target_link_options(kyt_options INTERFACE -fsanitize=fuzzer-no-link)

@@ -40,6 +40,10 @@
 
 namespace kyt {
 
+namespace client {
+struct Command;
+}
+
 // The domain of errors that the library itself gives, and their codes.
 inline constexpr char kKYTReportingClientErrorDomain[] = "KYTReportingClientErrorDomain";
 enum class ClientError : int32_t {
@@ -140,6 +144,7 @@ class KYT_EXPORT KYTReporting {
  private:
   class Implementation;
   explicit KYTReporting(std::shared_ptr<Implementation> implementation);
+  void enqueue(std::unique_ptr<client::Command> command);
   std::shared_ptr<Implementation> implementation_;  // shared with the library's thread
 };
 
