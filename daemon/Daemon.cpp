@@ -25,12 +25,14 @@ namespace {
 
 constexpr int kCouldNotStart = 1;
 constexpr int kNotConfined = -1;
-constexpr uint32_t kFolderMode = 0755;
+constexpr uint32_t kPublicFolder = 0755;   // clients look the socket up in it
+constexpr uint32_t kPrivateFolder = 0750;  // identifiers, and what was sent
 
 // The folders that the daemon writes to, which the confinement names, so they must exist before it.
 std::optional<std::string> makeMissingFolders(const Paths& paths) {
-  for (const std::string& folder : {paths.run(), paths.userDefaults(), paths.messageLogs()})
-    if (auto error = makeFolders(folder, kFolderMode)) return error;
+  if (auto error = makeFolders(paths.run(), kPublicFolder)) return error;
+  for (const std::string& folder : {paths.userDefaults(), paths.messageLogs()})
+    if (auto error = makeFolders(folder, kPrivateFolder)) return error;
   return std::nullopt;
 }
 
@@ -115,6 +117,7 @@ int runDaemon(const DaemonOptions& options) {
 
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
+  log.debug("main: At most %llu descriptors", static_cast<unsigned long long>(raiseDescriptorLimit()));
   StopSignals stopSignals;
   log.normal("startLogging: Daemon starts logging...");
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);

@@ -1,6 +1,8 @@
 // The daemon as a process: how it starts, serves real clients, and ends.
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <filesystem>
@@ -69,6 +71,28 @@ TEST_F(Daemon, StartsInOrderAndEndsOnSIGTERM) {
   EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_TRUE(daemon_.logged("main: Ending on signal 15"));
   EXPECT_FALSE(std::filesystem::exists(daemon_.socketPath()));
+}
+
+TEST_F(Daemon, RaisesItsLimitOfDescriptorsToWhatItMayHave) {
+  rlimit limit = {};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
+  const rlimit low = {std::min<rlim_t>(limit.rlim_max, 256), limit.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
+  const bool started = daemon_.startAndWait();
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
+  ASSERT_TRUE(started) << daemon_.log();
+  const auto expected = static_cast<unsigned long long>(std::min<rlim_t>(limit.rlim_max, 1 << 20));
+  EXPECT_TRUE(daemon_.logged("main: At most " + std::to_string(expected) + " descriptors")) << daemon_.log();
+}
+
+TEST_F(Daemon, MakesItsMissingFolders) {
+  ASSERT_TRUE(daemon_.startAndWait());
+  const auto mode = [this](const char* folder) {
+    return std::filesystem::status(daemon_.root() / folder).permissions() & std::filesystem::perms::all;
+  };
+  EXPECT_EQ(mode("run/kytreportingd"), std::filesystem::perms{0755});
+  EXPECT_EQ(mode("var/lib/kytreportingd/defaults"), std::filesystem::perms{0750});
+  EXPECT_EQ(mode("var/mobile/Library/Logs/Faultbin/Retired"), std::filesystem::perms{0750});
 }
 
 TEST_F(Daemon, EndsOnSIGINTToo) {

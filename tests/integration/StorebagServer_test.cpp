@@ -159,7 +159,8 @@ TEST_F(StorebagServer, BeingDeadLeavesOneFamilyItsBuiltInBagAndOthersNone) {
   EXPECT_TRUE(daemon_.logged("fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
   EXPECT_FALSE(daemon_.logged("Loading default storebag"));
   const std::string states = configured(kCadmor);
-  EXPECT_TRUE(states == "none" || states == "live:") << states << ", but the diagnostics adaptor has no state";
+  EXPECT_TRUE(states == "none" || states == "live:")
+      << states << ", but the diagnostics adaptor has no state";
   EXPECT_TRUE(daemon_.logged("fetchStorebagWithName: Loading default storebag 'cadmor'"));
   EXPECT_FALSE(daemon_.logged("fetchAndCacheStorebag: Unable to fetch storebag for client type 7"));
 }

@@ -13,5 +13,8 @@ namespace kyt {
 // The folder that a file is in.
 [[nodiscard]] std::string folderOf(const std::string& path);
 [[nodiscard]] uint32_t currentUser();
+// Lets the process open as many descriptors as it may be allowed to, since service managers start programs
+// with a low limit that they may raise themselves. How many that are; 0 when the system refuses.
+[[nodiscard]] uint64_t raiseDescriptorLimit();
 
 }  // namespace kyt
