@@ -65,7 +65,7 @@ Session::~Session() {
 }
 
 bool Session::enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payload, uint32_t flag) {
-  if (inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed)) {
+  if (refuses()) {
     droppedClosed_.fetch_add(1, std::memory_order_relaxed);
     return false;
   }
@@ -89,7 +89,7 @@ bool Session::enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payl
 }
 
 void Session::enqueueCommand(std::unique_ptr<Command> command) {
-  if (inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed)) {
+  if (refuses()) {
     command->fail(ClientError::closed, "the session is closed");
     return;
   }
@@ -124,7 +124,7 @@ KYTReporting::Statistics Session::statistics() const {
 }
 
 bool Session::finishAndWait(milliseconds timeout) {
-  if (inert_ || closed_) return false;
+  if (refuses()) return false;
   auto command = std::make_unique<Command>(Command::Kind::finish);
   command->successCompletion = [this](bool success, std::optional<Error>) {
     MutexLock lock(stateMutex_);
@@ -133,6 +133,7 @@ bool Session::finishAndWait(milliseconds timeout) {
     stateChanged_.notify_all();
   };
   enqueueCommand(std::move(command));
+  saidGoodbye_ = true;
   if (loop_->isCurrentThread()) return false;
   std::unique_lock<std::mutex> lock(stateMutex_.native());
   stateChanged_.wait_for(lock, timeout, [this]() NO_THREAD_SAFETY_ANALYSIS { return goodbyeOver_; });

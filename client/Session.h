@@ -47,7 +47,6 @@ class Session {
   // Nothing runs for this session any more once it has returned (on the library's thread: once the running
   // completion has). Safe to call twice.
   void close();
-  [[nodiscard]] bool isInert() const { return inert_.load(std::memory_order_relaxed); }
 
   // The library's thread, or a child process just forked.
   void becomeInert();
@@ -81,6 +80,10 @@ class Session {
     std::vector<int> descriptors;
   };
 
+  [[nodiscard]] bool refuses() const {
+    return inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed) ||
+           saidGoodbye_.load(std::memory_order_relaxed);
+  }
   void noticeWork();
   void connect(SteadyTime now);
   void disconnected(SteadyTime now, const char* reason);
@@ -109,7 +112,7 @@ class Session {
   // Any thread.
   MessageRing<Item> ring_;
   std::atomic<size_t> queuedBytes_{0};
-  std::atomic<bool> closed_{false}, inert_{false}, connected_{false};
+  std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
   std::atomic<uint64_t> sent_{0}, droppedQueueFull_{0}, lost_{0}, droppedClosed_{0}, droppedInvalid_{0},
       connections_{0};
   Mutex overflowMutex_;
