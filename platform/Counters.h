@@ -14,34 +14,34 @@ namespace kyt {
 class Log;
 
 enum class Reason : uint8_t {
-  malformedMessage,          // a connection ended for breaking the protocol
-  invalidArguments,          // a call answered InvalidArgs
+  malformedMessage,  // a connection ended for breaking the protocol
+  invalidArguments,  // a call answered InvalidArgs
   unentitledConnection,
   handshakeFailed,
   handshakeTimedOut,
   messageTooLong,
   tooManyConnections,
   tooManyConnectionsOfUser,
-  queuedBytesExceeded,       // reading from a client stopped
-  clientNotReading,          // … and its connection ended
+  queuedBytesExceeded,  // reading from a client stopped
+  clientNotReading,     // … and its connection ended
   aggregatorMessageDropped,
-  batchFull,                 // an event dropped because its back end's batch is full
-  eventDroppedByState,       // a disabled back end dropped an event
-  batchDiscarded,            // records discarded with a batch whose back end is not enabled
-  batchedEventFiltered,      // records rejected by the lists at a flush
+  batchFull,             // an event dropped because its back end's batch is full
+  eventDroppedByState,   // a disabled back end dropped an event
+  batchDiscarded,        // records discarded with a batch whose back end is not enabled
+  batchedEventFiltered,  // records rejected by the lists at a flush
   postWithoutURL,
-  postWithoutPoster,         // a request whose session was gone: nothing was sent
-  postFailed,                // a request ended with a transport error; its events are lost
-  postRefused,               // a server answered 4xx or 5xx
-  waitingRequestDisplaced,   // a request dropped while waiting for connectivity
-  workersExhausted,          // work waited because all workers were in use
+  postWithoutPoster,        // a request whose session was gone: nothing was sent
+  postFailed,               // a request ended with a transport error; its events are lost
+  postRefused,              // a server answered 4xx or 5xx
+  waitingRequestDisplaced,  // a request dropped while waiting for connectivity
+  workersExhausted,         // work waited because all workers were in use
   sharedDataRefused,
   hierarchyTokenRefused,
   uploadTooLarge,
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
-  valueNotPostable,          // a record's value removed because JSON cannot carry it
+  valueNotPostable,  // a record's value removed because JSON cannot carry it
   numberOfReasons
 };
 

@@ -20,7 +20,8 @@ class Function<Result(Arguments...)> {
   Function() noexcept = default;
   Function(std::nullptr_t) noexcept {}  // NOLINT(google-explicit-constructor)
   template <typename F, typename D = std::decay_t<F>,
-            typename = std::enable_if_t<!std::is_same_v<D, Function> && std::is_invocable_r_v<Result, D&, Arguments...>>>
+            typename = std::enable_if_t<!std::is_same_v<D, Function> &&
+                                        std::is_invocable_r_v<Result, D&, Arguments...>>>
   Function(F&& f) {  // NOLINT(google-explicit-constructor)
     if constexpr (sizeof(D) <= kInline && alignof(D) <= alignof(std::max_align_t) &&
                   std::is_nothrow_move_constructible_v<D>) {

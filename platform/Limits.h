@@ -9,30 +9,31 @@ namespace kyt {
 
 // Set in kytreportingd.toml; the numbers are the defaults.
 struct Limits {
-  uint64_t maxMessageBytes = 1048576;              // one IPC message, header and body: a client's buffer
-  uint64_t maxQueuedBytes = 4194304;               // replies and callbacks waiting for one client; twice that ends it
-  uint64_t maxConnections = 16384;                 // all clients: descriptors
-  uint64_t maxConnectionsPerUser = 4096;           // one user cannot shut out the others
-  uint64_t maxUploadBytes = 268435456;             // one file: it is read into memory
-  uint64_t maxBatchBytes = 16777216;               // one back end's batch; then new events are dropped
-  uint64_t maxHierarchyTokensPerUser = 4096;       // tokens' arrays stay for the life of the process
-  uint64_t maxSharedDataBytesPerUser = 16777216;   // so does their shared data
-  double idleExitSeconds = 30;                     // socket-activated and without a session
-  double shutdownGraceSeconds = 5;                 // from SIGTERM to cancelling what is left
+  uint64_t maxMessageBytes = 1048576;     // one IPC message, header and body: a client's buffer
+  uint64_t maxQueuedBytes = 4194304;      // replies and callbacks waiting for one client; twice that ends it
+  uint64_t maxConnections = 16384;        // all clients: descriptors
+  uint64_t maxConnectionsPerUser = 4096;  // one user cannot shut out the others
+  uint64_t maxUploadBytes = 268435456;    // one file: it is read into memory
+  uint64_t maxBatchBytes = 16777216;      // one back end's batch; then new events are dropped
+  uint64_t maxHierarchyTokensPerUser = 4096;      // tokens' arrays stay for the life of the process
+  uint64_t maxSharedDataBytesPerUser = 16777216;  // so does their shared data
+  double idleExitSeconds = 30;                    // socket-activated and without a session
+  double shutdownGraceSeconds = 5;                // from SIGTERM to cancelling what is left
 
   // Fixed.
-  static constexpr int maxObjectDepth = 32;                    // property lists and JSON: recursion
-  static constexpr int maxIPCDepth = 64;                       // the wire protocol's own: 32 arrays + 32 structs, and variants
-  static constexpr size_t maxHTTPReplyBytes = 4u << 20;        // a server cannot fill the memory
-  static constexpr size_t maxPropertyListTags = 131072;         // each takes up to 128 bytes while it is read
-  static constexpr size_t maxWaitingBytes = 16u << 20;         // request bodies waiting for connectivity, each URL session
-  static constexpr size_t maxWorkers = 512;                    // threads
-  static constexpr size_t maxHandshakeBytes = 16384;           // before authentication
+  static constexpr int maxObjectDepth = 32;  // property lists and JSON: recursion
+  static constexpr int maxIPCDepth = 64;     // the wire protocol's own: 32 arrays + 32 structs, and variants
+  static constexpr size_t maxHTTPReplyBytes = 4u << 20;  // a server cannot fill the memory
+  static constexpr size_t maxPropertyListTags = 131072;  // each takes up to 128 bytes while it is read
+  static constexpr size_t maxWaitingBytes =
+      16u << 20;                             // request bodies waiting for connectivity, each URL session
+  static constexpr size_t maxWorkers = 512;  // threads
+  static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
   static constexpr double handshakeSeconds = 30;
   static constexpr size_t maxDescriptorsPerMessage = 16;
-  static constexpr unsigned turnCalls = 256;                   // a connection hands its worker back after so many calls
-  static constexpr size_t turnBytes = 1u << 20;                // … or so many bytes
-  static constexpr size_t maxCustomIdentifiers = 1000;         // "uuid:…" user defaults that the daemon writes
+  static constexpr unsigned turnCalls = 256;     // a connection hands its worker back after so many calls
+  static constexpr size_t turnBytes = 1u << 20;  // … or so many bytes
+  static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };
 
 }  // namespace kyt

@@ -46,7 +46,8 @@ class TimerService {
   virtual TimerHandle after(Duration delay, std::shared_ptr<SerialQueue> queue, Task work) = 0;
   // Runs `work` on `queue` first one period from now and then every period (at least 1 ms); up to `leeway` late, so
   // that wake-ups can be shared. Ticks that were missed are not made up for.
-  virtual TimerHandle every(Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue, Task work) = 0;
+  virtual TimerHandle every(Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue,
+                            Task work) = 0;
 };
 
 }  // namespace kyt

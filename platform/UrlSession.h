@@ -23,22 +23,24 @@ namespace kyt {
 
 // The domain of transport failures; the code is libcurl's (CURLcode), or one of the two below.
 inline constexpr char kKYTURLErrorDomain[] = "KYTURLErrorDomain";
-inline constexpr int32_t kURLErrorCancelled = -999;         // the session was cancelled (shut-down)
-inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;   // displaced while waiting for connectivity
+inline constexpr int32_t kURLErrorCancelled = -999;        // the session was cancelled (shut-down)
+inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;  // displaced while waiting for connectivity
 
 struct URLRequest {
   std::string method = "GET";
   std::string url;
-  std::vector<std::pair<std::string, std::string>> headers;  // sent in this order; control characters are removed
+  std::vector<std::pair<std::string, std::string>>
+      headers;  // sent in this order; control characters are removed
   Data body;
   std::optional<Duration> timeout;  // from start to end, progress or not; none: only the no-progress time-out
   bool allowsCellularAccess = true;
-  int maxRedirects = 0;             // followed only while they stay on https
+  int maxRedirects = 0;  // followed only while they stay on https
 };
 
 struct URLResponse {
   int status = 0;
-  std::vector<std::pair<std::string, std::string>> headers;  // of the last response, in order, names as received
+  std::vector<std::pair<std::string, std::string>>
+      headers;  // of the last response, in order, names as received
   // The first header of that name, compared without case.
   [[nodiscard]] std::optional<std::string_view> header(std::string_view name) const;
 };
@@ -47,8 +49,9 @@ struct URLResponse {
 using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
 
 struct URLSessionConfiguration {
-  std::string sourceApplication;     // sent as X-KYT-Source-Application; empty: not sent
-  bool waitsForConnectivity = false;  // a request that cannot leave (no route, no resolver) waits for the network
+  std::string sourceApplication;  // sent as X-KYT-Source-Application; empty: not sent
+  bool waitsForConnectivity =
+      false;  // a request that cannot leave (no route, no resolver) waits for the network
 };
 
 // A handle to a request that was started; dropping it changes nothing.

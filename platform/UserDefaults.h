@@ -22,7 +22,8 @@ class UserDefaults {
   // Strings, booleans, integers and doubles; null when the key has no value or the file cannot be read.
   [[nodiscard]] virtual Value value(std::string_view domain, std::string_view key) = 0;
   // A null value removes the key. Replaces the file atomically; an error leaves what was there.
-  [[nodiscard]] virtual std::optional<Error> set(std::string_view domain, std::string_view key, Value value) = 0;
+  [[nodiscard]] virtual std::optional<Error> set(std::string_view domain, std::string_view key,
+                                                 Value value) = 0;
   // Stores `value` unless the key already has a string; answers what is stored afterwards, also under concurrent
   // callers of other processes. On an error answers `value`, unstored (counted and logged by the adapter).
   [[nodiscard]] virtual String stringOrStore(std::string_view domain, std::string_view key, String value) = 0;

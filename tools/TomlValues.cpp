@@ -42,7 +42,8 @@ Value converted(const TomlNode& node) {
 
 std::variant<Value, Error> parseToml(std::string_view text) {
   auto parsed = kyt::parseToml(text, "bag");
-  if (const auto* error = std::get_if<TomlError>(&parsed)) return Error{"KYTToolsErrorDomain", -1, error->text};
+  if (const auto* error = std::get_if<TomlError>(&parsed))
+    return Error{"KYTToolsErrorDomain", -1, error->text};
   return Value(convertedTable(std::get<TomlTable>(parsed)));
 }
 
