@@ -1,0 +1,151 @@
+// The main job with everything real: client processes, the daemon, the development server.
+#include <gtest/gtest.h>
+
+#include "tests/integration/StageFixture.h"
+
+namespace kyt {
+namespace {
+
+constexpr int kCadmor = 20, kDulvek = 8;
+
+class WholeSystem : public StageTest {};
+
+TEST_F(WholeSystem, ShowsItselfInTheDemonstration) {
+  const ProgramRun demonstration = runProgram(std::string(KYT_PROGRAMS) + "/kytdemo",
+                                              {"--programs", KYT_PROGRAMS, "--share", KYT_SHARE, "--once"});
+  EXPECT_EQ(demonstration.status, 0) << demonstration.text;
+  EXPECT_NE(demonstration.text.find("ok     nothing else arrived: 20 events in all"), std::string::npos);
+}
+
+TEST_F(WholeSystem, CarriesTheEventsOfTheExamples) {
+  lay();
+  putBag("cadmor", {entry("example")});
+  startDaemon();
+  for (const char* program : {KYT_EXAMPLE_CPP, KYT_EXAMPLE_C}) {
+    const ProgramRun example = runProgram(program, {socket()});
+    EXPECT_EQ(example.status, 0) << program << ": " << example.text;
+    EXPECT_NE(example.text.find("live: httppost"), std::string::npos) << example.text;
+    EXPECT_NE(example.text.find("lost 0"), std::string::npos) << example.text;
+  }
+  // Each sends three batched events between its start and its stop message, the first a realtime one too.
+  EXPECT_TRUE(arrive("client=example", 11)) << daemonLog();
+  EXPECT_EQ(arrived("client=example&service=demo&method=10&status=1"), 6);
+  EXPECT_EQ(arrived("client=example&service=demo&method=20&status=2"), 1);
+  EXPECT_EQ(arrived("client=example&method=0&status=1"), 2) << "stop messages";
+  EXPECT_EQ(total("bad"), 0);
+}
+
+TEST_F(WholeSystem, PostsNothingOfAnOwnerWhoWithdrewConsentUnlessTheBagOverrides) {
+  lay();
+  Dictionary overriding = entry("overriding");
+  overriding.set("override_dnu", 1);
+  putBag("cadmor", {entry("respecting"), overriding});
+  startDaemon();
+  ASSERT_EQ(kytctl({"consent", "withdraw"}).status, 0);
+  {
+    TestClient respecting(socket(), kCadmor, "respecting");
+    EXPECT_EQ(respecting.configure(), "live:") << "state 1 is not live";
+    EXPECT_TRUE(respecting.send(3, 4, Dictionary{{"k", 1}}));
+    EXPECT_TRUE(respecting.send(3, 5, Dictionary{{"k", 2}}, 1));
+    EXPECT_EQ(respecting.flush(), "error: Nothing to flush");
+    EXPECT_TRUE(respecting.finish());
+  }
+  {
+    TestClient other(socket(), kCadmor, "overriding");
+    EXPECT_EQ(other.configure(), "live: httppost");
+    EXPECT_TRUE(other.send(3, 4, Dictionary{{"k", 1}}));
+    EXPECT_TRUE(other.finish());
+  }
+  EXPECT_TRUE(arrive("client=overriding", 3)) << daemonLog();
+  EXPECT_EQ(arrived("client=respecting"), 0);
+
+  ASSERT_EQ(kytctl({"consent", "grant"}).status, 0);
+  TestClient respecting(socket(), kCadmor, "respecting");
+  EXPECT_EQ(respecting.configure(), "live: httppost") << "consent is asked for each session";
+  EXPECT_TRUE(respecting.send(3, 4, Dictionary{{"k", 1}}));
+  EXPECT_TRUE(respecting.finish());
+  EXPECT_TRUE(arrive("client=respecting", 3)) << daemonLog();
+  EXPECT_EQ(arrived("client=respecting"), 3);
+}
+
+TEST_F(WholeSystem, TakesAnotherEnvironmentAndAnotherAddressFromUserDefaults) {
+  lay();
+  const Dictionary bag{{"version", "1"},
+                       {"release", section({entry("switching", "/events/release")})},
+                       {"development", section({entry("switching", "/events/development")})}};
+  ASSERT_FALSE(stage_->putStorebag("cadmor", bag));
+  // The environment is looked at when a bag is fetched, and is not for a bag that is answered as unchanged.
+  ASSERT_FALSE(
+      tools::writeFile(stage_->folder() + "/bags/cadmor.toml", "max_age = 0\nlast_modified = false\n", 0644));
+  startDaemon();
+  const auto postsTo = [this](const std::string& path) {
+    long count = 0;
+    const Value answer = stage_->query("/api/posts?limit=1000");
+    const Value* posts = answer.dictionary() != nullptr ? answer.dictionary()->find("posts") : nullptr;
+    if (posts == nullptr || posts->array() == nullptr) return -1L;
+    for (const Value& post : *posts->array())
+      count += *post.dictionary()->find("path") == Value(path) ? 1 : 0;
+    return count;
+  };
+  long events = 0;
+  const auto runSession = [&] {
+    TestClient client(socket(), kCadmor, "switching");
+    EXPECT_EQ(client.configure(), "live: httppost") << daemonLog();
+    EXPECT_TRUE(client.finish());
+    events += 2;
+    EXPECT_TRUE(arrive("client=switching", events)) << daemonLog();
+  };
+  runSession();
+  EXPECT_EQ(postsTo("/events/release"), 1);
+
+  ASSERT_EQ(
+      kytctl({"defaults", "write", "com.vantu.kytreporting", "environmentType", "1", "--type", "integer"})
+          .status,
+      0);
+  runSession();
+  EXPECT_EQ(postsTo("/events/development"), 1);
+  EXPECT_TRUE(logged("userDefaultsEnvironment: Environment type 1"));
+
+  ASSERT_EQ(kytctl({"defaults", "write", "com.vantu.kytreporting", "httpsPostURL",
+                    stage_->httpsBase() + "/events/mine"})
+                .status,
+            0);
+  runSession();
+  EXPECT_EQ(postsTo("/events/mine"), 1) << "the user default is stronger than the bag";
+  ASSERT_EQ(
+      kytctl({"defaults", "write", "com.vantu.kytreporting", "environmentType", "4", "--type", "integer"})
+          .status,
+      0);
+  runSession();
+  EXPECT_EQ(postsTo("/events/mine"), 2) << "in every environment";
+
+  ASSERT_EQ(kytctl({"defaults", "delete", "com.vantu.kytreporting", "httpsPostURL"}).status, 0);
+  runSession();
+  EXPECT_EQ(postsTo("/events/release"), 2);
+  EXPECT_EQ(postsTo("/events/development"), 1);
+}
+
+TEST_F(WholeSystem, SendsEverySessionsStopMessageAndBatchWhenItIsTerminated) {
+  lay();
+  putBag("dulvek", {entry("ending")});
+  startDaemon();
+  constexpr int kSessions = 20;
+  std::vector<std::unique_ptr<TestClient>> clients;
+  for (int i = 0; i < kSessions; ++i) {
+    clients.push_back(std::make_unique<TestClient>(socket(), kDulvek, "ending", 1000 + i));
+    ASSERT_EQ(clients.back()->configure(), "live: httppost");
+    EXPECT_TRUE(clients.back()->send(9, 1, Dictionary{{"number", i}}));
+    // Answered after what was sent before it.
+    EXPECT_EQ(clients.back()->displayURL(), "https://display.example.org/");
+  }
+  EXPECT_EQ(arrived("client=ending"), 0) << "nothing has been flushed so far";
+  const auto begin = std::chrono::steady_clock::now();
+  EXPECT_EQ(stage_->stopDaemon().value_or(-1), 0) << daemonLog();
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(5)) << "the grace time";
+  EXPECT_EQ(arrived("client=ending&method=9"), kSessions);
+  EXPECT_EQ(arrived("client=ending&method=0&status=0"), kSessions);
+  EXPECT_EQ(arrived("client=ending&method=0&status=1"), kSessions);
+}
+
+}  // namespace
+}  // namespace kyt
