@@ -74,25 +74,26 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
       filter.method = intEntry(*dictionary, "method", -1);
       filter.status = intEntry(*dictionary, "status", -1);
       const Value* key = dictionary->find("key");
-      if (key != nullptr && key->string() != nullptr) filter.foldedKey = foldCase(*key->string());
+      if (key != nullptr && key->string() != nullptr) {
+        filter.foldedKey = foldCase(*key->string());
+        keyLengths_ |= lengthBit(filter.foldedKey->size());
+      }
       const Value* action = dictionary->find("action");
       const String* name = action != nullptr ? action->string() : nullptr;
       if (name != nullptr && *name == "remove") filter.action = Action::remove;
       if (name != nullptr && *name == "sha256") filter.action = Action::sha256;
     }
-    // Without a key it takes its place in the table and is about no key.
-    if (!filter.foldedKey.empty()) keyLengths_ |= lengthBit(filter.foldedKey.size());
     filters_.push_back(std::move(filter));
   }
 }
 
 EventFilters::Action EventFilters::actionForKey(std::string_view key, int32_t method, int32_t status) const {
-  if ((keyLengths_ & lengthBit(key.size())) == 0 || key.empty()) return Action::keep;
+  if ((keyLengths_ & lengthBit(key.size())) == 0) return Action::keep;
   for (const Filter& filter : filters_) {
-    if (filter.foldedKey.size() != key.size()) continue;
+    if (!filter.foldedKey || filter.foldedKey->size() != key.size()) continue;
     if (filter.method >= 0 && filter.method != method) continue;
     if (filter.status >= 0 && filter.status != status) continue;
-    if (equalsFolded(key, filter.foldedKey)) return filter.action;
+    if (equalsFolded(key, *filter.foldedKey)) return filter.action;
   }
   return Action::keep;
 }

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -40,7 +41,7 @@ class EventFilters {
     int32_t method = -1;  // negative: any
     int32_t status = -1;  // negative: any
     Action action = Action::keep;
-    std::string foldedKey;
+    std::optional<std::string> foldedKey;  // none: takes its place in the table and is about no key
   };
   [[nodiscard]] Action actionForKey(std::string_view key, int32_t method, int32_t status) const;
 

@@ -102,10 +102,13 @@ TEST_F(EventFiltersTest, ALaterTableReplacesTheEarlierOne) {
 }
 
 TEST_F(EventFiltersTest, ElementsThatAreNoFiltersAreAboutNoKey) {
-  const Array table{Value(5), Dictionary{{"action", "remove"}}, Dictionary{{"key", 7}, {"action", "remove"}},
-                    filter("", "remove")};
+  const Array table{Value(5), Dictionary{{"action", "remove"}}, Dictionary{{"key", 7}, {"action", "remove"}}};
   EXPECT_EQ(filtered(table, {{"", 1}, {"7", 2}}), (Dictionary{{"", 1}, {"7", 2}}));
-  EXPECT_EQ(filters_.numberOfFilters(), 4);
+  EXPECT_EQ(filters_.numberOfFilters(), 3);
+}
+
+TEST_F(EventFiltersTest, AnEmptyKeyIsAKeyLikeAnyOther) {
+  EXPECT_EQ(filtered({filter("", "remove")}, {{"", 1}, {"k", 2}}), (Dictionary{{"k", 2}}));
 }
 
 TEST_F(EventFiltersTest, FindsKeysOfEveryLength) {
