@@ -122,9 +122,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void forgetSizesOnQueue();
   void appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes);
   void countDroppedByLimit() const;
-  [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records);
+  [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records, uint64_t& bytes);
   [[nodiscard]] bool admits(const Dictionary& record) const;
-  [[nodiscard]] Array recordsToPost(Array batch) const;
+  [[nodiscard]] Array recordsToPost(Array batch, uint64_t bytes) const;
 
   // The message and its request.
   void removeUnpostable(Dictionary& record) const;

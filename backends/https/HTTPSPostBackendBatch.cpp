@@ -1,6 +1,7 @@
 // The batch and its flush. What touches the batch runs on the state queue; messages are built and completions
 // run after it has been left.
 #include <algorithm>
+#include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "platform/Counters.h"
@@ -119,21 +120,22 @@ void HTTPSPostBackend::countDroppedByLimit() const {
       name_.c_str(), static_cast<unsigned long long>(platform_.limits.maxBatchBytes));
 }
 
-HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records) {
+HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records, uint64_t& bytes) {
   if (!batchedEvents_) return BatchTaking::nothing;
   const bool enabled = state_ == kBackendStateEnabled;
   if (enabled && requireUserInfo_ && !hasUserInfo()) return BatchTaking::userInfoMissing;
   records = std::move(*batchedEvents_);
   batchedEvents_.reset();
   eventMethodCounts_.clear();
-  batchedBytes_ = 0;
+  bytes = std::exchange(batchedBytes_, 0);
   forgetSizesOnQueue();
   return enabled ? BatchTaking::taken : BatchTaking::discarded;
 }
 
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   Array batch;
-  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch); })) {
+  uint64_t bytes = 0;
+  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch, bytes); })) {
     case BatchTaking::discarded:
       platform_.counters.add(Reason::batchDiscarded, batch.size());
       [[fallthrough]];
@@ -147,7 +149,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
       break;
   }
   platform_.log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
-  Array records = recordsToPost(std::move(batch));
+  Array records = recordsToPost(std::move(batch), bytes);
   Value pretty;
   std::optional<std::string> json;
   if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty);
@@ -184,10 +186,16 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
 }
 
 // The records that the lists admit, each with the user information of now, filtered, over what it had.
-Array HTTPSPostBackend::recordsToPost(Array batch) const {
+// `bytes` is what the batch held. User information that came after the records makes every one of them
+// larger, and must not make of a batch within its limit a message past all bounds: then the newest are
+// dropped.
+Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   Dictionary userInfo;
   if (userInfoDict_) userInfo = *userInfoDict_;
   filterEvent(userInfo);
+  const uint64_t limit = platform_.limits.maxBatchBytes;
+  const bool mayOutgrow = bytes + batch.size() * heldBytes(userInfo) > limit;
+  uint64_t kept = 0;
   Array records;
   records.reserve(batch.size());
   Value* values = batch.mutableBegin();
@@ -198,6 +206,10 @@ Array HTTPSPostBackend::recordsToPost(Array batch) const {
       continue;
     }
     record->merge(userInfo);
+    if (mayOutgrow && (kept += heldBytes(*record)) > limit) {
+      countDroppedByLimit();
+      continue;
+    }
     records.append(std::move(values[i]));
   }
   return records;

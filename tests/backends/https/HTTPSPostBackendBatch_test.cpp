@@ -371,6 +371,35 @@ TEST_F(HTTPSPostBackendBatch, CountsWhatContainersHoldTowardsItsLimit) {
   EXPECT_EQ(dropped(Reason::batchFull), 2u);
 }
 
+TEST_F(HTTPSPostBackendBatch, LateUserInformationDoesNotMakeAMessagePastTheLimit) {
+  platform_.limits.maxBatchBytes = 100000;
+  userInfo_ = std::nullopt;
+  backend();
+  for (uint16_t i = 1; i <= 40; ++i) send(i);
+  EXPECT_EQ(dropped(Reason::batchFull), 0u);
+  backend().setUserInfoDict(Dictionary{{kKYTReportingUserInfoClientName, "a"},
+                                       {kKYTReportingUserInfoServiceName, "b"},
+                                       {"note", std::string(10000, 'x')}});
+  decided();
+  flush();
+  const std::vector<Dictionary> records = events(0);
+  EXPECT_GT(records.size(), 5u);
+  EXPECT_LT(records.size(), 10u);
+  EXPECT_EQ(records.front().find("_method")->intValue(), 1);  // the newest are dropped
+  EXPECT_EQ(records.size() + dropped(Reason::batchFull), 40u);
+}
+
+TEST_F(HTTPSPostBackendBatch, UserInformationThatTheRecordsHaveAlreadyCountsOnce) {
+  userInfo_->set("note", std::string(1000, 'x'));
+  platform_.limits.maxBatchBytes = 100000;
+  inState(kBackendStateEnabled);
+  uint16_t batched = 0;
+  while (dropped(Reason::batchFull) == 0) send(++batched);
+  flush();
+  EXPECT_EQ(events(0).size(), batched - 1u);
+  EXPECT_EQ(dropped(Reason::batchFull), 1u);
+}
+
 TEST_F(HTTPSPostBackendBatch, AppendsLaterOnTheStateQueue) {
   inState(kBackendStateEnabled);
   platform_.executor.runAll();
