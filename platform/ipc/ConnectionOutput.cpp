@@ -54,7 +54,8 @@ void ConnectionOutput::open() {
 
 ConnectionOutput::Event ConnectionOutput::queued() {
   Event event = Event::none;
-  if (!waiting_ && (!held_ || pending_.size() - written_ >= kMostHeldBytes)) event = flush();
+  const bool mayHold = held_ && waitingBytes() < kMostHeldBytes && waitingBytes() <= maxQueuedBytes_;
+  if (!waiting_ && !mayHold) event = flush();
   const size_t left = waitingBytes();
   if (event == Event::broken || left <= maxQueuedBytes_) return event;
   if (left > 2 * maxQueuedBytes_) {
@@ -78,9 +79,8 @@ ConnectionOutput::Event ConnectionOutput::flush() {
       }
       const bool mayGoOn = paused_ && pending_.size() - written_ <= maxQueuedBytes_ / 2;
       if (mayGoOn) paused_ = false;
-      if (waiting_) return mayGoOn ? Event::drainedAndNeedsRoom : Event::needsRoom;
       waiting_ = true;
-      return Event::needsRoom;
+      return mayGoOn ? Event::drainedAndNeedsRoom : Event::needsRoom;
     }
     if (result.status != StreamStatus::ok) {
       dead_ = true;

@@ -110,7 +110,11 @@ class Connected : public ::testing::Test, public ListenerDelegate {
     return bytes;
   }
 
-  Limits limits_;
+  Limits limits_ = [] {
+    Limits limits;
+    limits.maxQueuedBytes = 20000;
+    return limits;
+  }();
   Counters counters_;
   MemoryLogSink sink_;
   Log log_{sink_, LogLevel::debug};
@@ -269,6 +273,27 @@ TEST_F(DBusConnectionTest, WaitsForRoomAndGoesOnWhereItStopped) {
     at += frame.size;
   }
   EXPECT_EQ(at, all.size());
+}
+
+TEST_F(DBusConnectionTest, PausesAClientThatDoesNotReadAndGoesOnAsItDoes) {
+  shakeHands();
+  pipe_->room = 5000;
+  constexpr int kCalls = 2000;
+  say(displayURLCalls(kCalls));
+  executor_.runAll();
+  EXPECT_LT(session_->calls, 700);
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::writable) << "it reads no more";
+  EXPECT_EQ(counters_.value(Reason::queuedBytesExceeded), 1u);
+  size_t answered = 0;
+  while ((reactor_.waitsFor(kStream) & ready::writable) != 0) {
+    answered += std::exchange(pipe_->fromServer, std::string()).size();
+    ASSERT_TRUE(reactor_.report(kStream, ready::writable));
+    executor_.runAll();
+  }
+  answered += pipe_->fromServer.size();
+  EXPECT_EQ(session_->calls, kCalls);
+  EXPECT_EQ(answered % kCalls, 0u);
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
 }
 
 TEST_F(DBusConnectionTest, HandlesWhatWasReadBeforeItFinishes) {
