@@ -121,6 +121,7 @@ DaemonServices::DaemonServices(Start start)
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
       configuration_{platform_, deviceIdentity_, environment_},
       backendFactory_(configuration_, backendTable(configuration_)),
+      messageLog_(start.paths.messageLogs(), fileManager_, clock_, log_, counters_),
       fetcher_(configuration_, backendClassLock_),
       sessionClass_(configuration_, backendFactory_, messageLog_),
       queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),

@@ -31,13 +31,14 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/system/LinuxDeviceProperties.h"
+#include "platform/linux/system/LinuxFileManager.h"
 #include "platform/linux/system/ProgramInspector.h"
 #include "platform/linux/system/ServiceManager.h"
 #include "platform/linux/system/TomlBundle.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "platform/linux/system/TomlUserDefaults.h"
 #include "platform/linux/url/CurlUrlSession.h"
-#include "session/MessageLog.h"
+#include "session/MessageLogFiles.h"
 #include "session/ReportingdSessionClass.h"
 
 namespace kyt {
@@ -98,7 +99,8 @@ class DaemonServices {
   Environment environment_;
   Configuration configuration_;
   DefaultBackendFactory backendFactory_;
-  DisabledMessageLog messageLog_;
+  LinuxFileManager fileManager_;
+  MessageLogFiles messageLog_;
   Mutex backendClassLock_;
   StorebagFetcher fetcher_;
   ReportingdSessionClass sessionClass_;

@@ -60,6 +60,8 @@ const char* reasonName(Reason reason) {
       return "bad-user-defaults-file";
     case Reason::badEntitlementsFile:
       return "bad-entitlements-file";
+    case Reason::messageLogLineLost:
+      return "message-log-line-lost";
     case Reason::valueNotPostable:
       return "value-not-postable";
     case Reason::numberOfReasons:

@@ -41,7 +41,8 @@ enum class Reason : uint8_t {
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
-  valueNotPostable,  // a record's value removed because JSON cannot carry it
+  messageLogLineLost,  // no file could be made or written, or it is full
+  valueNotPostable,    // a record's value removed because JSON cannot carry it
   numberOfReasons
 };
 

@@ -33,6 +33,7 @@ struct Limits {
   static constexpr size_t maxDescriptorsPerMessage = 16;
   static constexpr unsigned turnCalls = 256;     // a connection hands its worker back after so many calls
   static constexpr size_t turnBytes = 1u << 20;  // … or so many bytes
+  static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };
 

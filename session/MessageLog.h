@@ -16,10 +16,4 @@ class MessageLog {
   virtual void writeToLogFile(const char* format, std::initializer_list<Value> objects) = 0;
 };
 
-// Keeps nothing: log files are not kept yet.
-class DisabledMessageLog final : public MessageLog {
- public:
-  void writeToLogFile(const char*, std::initializer_list<Value>) override {}
-};
-
 }  // namespace kyt

@@ -6,6 +6,7 @@
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/TextEscape.h"
 #include "session/FileURL.h"
 #include "session/FlushFanIn.h"
 #include "session/MessageLog.h"
@@ -59,7 +60,7 @@ void ReportingdSession::uploadFileWithURL(const String& fileURL, const String& e
   else
     log().error("uploadFileWithURL: File upload failed for %s", shownPath);
   class_.messageLog().writeToLogFile("[uploadFileWithURL] Upload %@ for file %@",
-                                     {success ? "succeeded" : "failed", fileURL});
+                                     {success ? "succeeded" : "failed", escapedText(fileURL)});
   if (completionHandler) completionHandler(success);
 }
 

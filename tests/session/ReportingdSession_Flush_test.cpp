@@ -138,6 +138,15 @@ TEST_F(SessionUpload, SucceedsWhenOneBackEndAcceptsAndAsksAll) {
             std::vector<std::string>{"[uploadFileWithURL] Upload succeeded for file file:///tmp/a%20b.log"});
 }
 
+TEST_F(SessionUpload, AClientsAddressCannotBeginALineOfTheMessageLog) {
+  configure({"httppost"});
+  EXPECT_FALSE(upload("file:///tmp/a\n(2026-01-31 12:00:00 +0000) forged"));
+  EXPECT_EQ(
+      messageLog_.lines(),
+      std::vector<std::string>{
+          "[uploadFileWithURL] Upload failed for file file:///tmp/a\\n(2026-01-31 12:00:00 +0000) forged"});
+}
+
 TEST_F(SessionUpload, FailsWhenNobodyAccepts) {
   configure({"httppost"});
   EXPECT_FALSE(upload("file:///tmp/a.log"));

@@ -1,0 +1,150 @@
+#include "session/MessageLogFiles.h"
+
+#include <string_view>
+#include <utility>
+#include <variant>
+
+#include "platform/Clock.h"
+#include "platform/Counters.h"
+#include "platform/FileManager.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/TextEscape.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr double kExpirySeconds = 86400;
+constexpr std::string_view kFirstField = "kytreportingd";
+constexpr std::string_view kLastField = "messageLog.diag";
+
+// Exactly three fields joined by "_", the first and the last of them ours.
+bool isLogFileName(std::string_view name) {
+  const size_t first = name.find('_');
+  const size_t last = name.rfind('_');
+  if (first == name.npos || first == last) return false;
+  return name.substr(0, first) == kFirstField && name.substr(last + 1) == kLastField &&
+         name.substr(first + 1, last - first - 1).find('_') == name.npos;
+}
+
+std::string escapedLines(std::string_view text) {
+  std::string out;
+  for (;;) {
+    const size_t end = text.find('\n');
+    appendEscaped(out, text.substr(0, end));
+    if (end == text.npos) return out;
+    out += '\n';
+    text.remove_prefix(end + 1);
+  }
+}
+
+std::string dateText(const std::optional<Date>& date) {
+  return description(date ? Value(*date) : Value());
+}
+
+}  // namespace
+
+MessageLogFiles::MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log,
+                                 Counters& counters)
+    : folder_(std::move(folder)), files_(files), clock_(clock), log_(log), counters_(counters) {}
+
+double MessageLogFiles::now() const {
+  return clock_.timeOfDay().asSeconds();
+}
+
+void MessageLogFiles::lineIsLost() {
+  counters_.add(Reason::messageLogLineLost);
+}
+
+void MessageLogFiles::writeToLogFile(const char* format, std::initializer_list<Value> objects) {
+  std::optional<File> file = currentFile();
+  if (!file) file = newFile();
+  if (!file) return lineIsLost();
+  const std::string line =
+      formatObjects("(%@) ", {Date{now()}}) + escapedLines(formatObjects(format, objects)) + "\n";
+  if (file->size + line.size() > Limits::maxMessageLogBytes) {
+    if (counters_.addAndMayLog(Reason::messageLogLineLost, clock_.monotonic()))
+      log_.error("writeToLogFile: %s is full, lines are lost until it expires", file->path.c_str());
+    return;
+  }
+  if (const std::optional<Error> error = files_.append(file->path, line)) {
+    log_.error("writeToLogFile: Error writing to log file %s: %s", file->path.c_str(),
+               error->localizedDescription.c_str());
+    deleteFile(*file);
+    return lineIsLost();
+  }
+  log_.normal("writeToLogFile: Saved log message to %s", file->path.c_str());
+}
+
+std::vector<std::string> MessageLogFiles::listing() {
+  auto names = files_.contentsOfDirectory(folder_);
+  if (auto* found = std::get_if<std::vector<std::string>>(&names)) return std::move(*found);
+  const Error& error = std::get<Error>(names);
+  if (error.code != kFileErrorNoSuchFile) {
+    log_.error("writeToLogFile: Error reading from log directory: %s", error.localizedDescription.c_str());
+    return {};
+  }
+  log_.normal("writeToLogFile: Creating kytreportingd log directory at %s", folder_.c_str());
+  // Whether that went well shows when a file is made in it.
+  static_cast<void>(files_.createDirectory(folder_));
+  return {};
+}
+
+// The newest file that has not expired; the others are deleted.
+std::optional<MessageLogFiles::File> MessageLogFiles::currentFile() {
+  std::optional<File> candidate;
+  for (const std::string& name : listing()) {
+    if (!isLogFileName(name)) continue;
+    File file{folder_ + "/" + name, std::nullopt, 0};
+    const std::optional<FileAttributes> attributes = files_.attributesOfItem(file.path);
+    if (!attributes || !attributes->isRegularFile) continue;  // deleted meanwhile, or no file
+    file.creationDate = attributes->creationDate;
+    file.size = attributes->size;
+    if (file.creationDate && now() - file.creationDate->secondsSince1970 > kExpirySeconds) {
+      deleteFile(file);
+    } else if (!candidate || !candidate->creationDate) {
+      // One whose age cannot be told gives way, and stays where it is.
+      candidate = std::move(file);
+    } else if (file.creationDate &&
+               file.creationDate->secondsSince1970 > candidate->creationDate->secondsSince1970) {
+      deleteFile(*candidate);
+      candidate = std::move(file);
+    } else {
+      deleteFile(file);
+    }
+  }
+  return candidate;
+}
+
+std::optional<MessageLogFiles::File> MessageLogFiles::newFile() {
+  const int started = static_cast<int32_t>(clock_.timeOfDay().seconds);
+  File file{folder_ + "/" + formatObjects("%@_%d_%@", {String(kFirstField), started, String(kLastField)}),
+            std::nullopt, 0};
+  // What counts is whether it is there.
+  static_cast<void>(files_.createFile(file.path));
+  const std::optional<FileAttributes> attributes = files_.attributesOfItem(file.path);
+  if (!attributes || !attributes->isRegularFile) {
+    log_.error("writeToLogFile: Failed to create new kytreportingd log file %s", file.path.c_str());
+    return std::nullopt;
+  }
+  file.creationDate = attributes->creationDate;
+  file.size = attributes->size;
+  log_.normal("writeToLogFile: Created new kytreportingd log file %s (%s)", file.path.c_str(),
+              dateText(file.creationDate).c_str());
+  return file;
+}
+
+// One text for expired and superseded files.
+void MessageLogFiles::deleteFile(const File& file) {
+  if (const std::optional<Error> error = files_.removeItem(file.path)) {
+    if (error->code == kFileErrorNoSuchFile) return;  // another call was here first
+    log_.error("writeToLogFile: Cannot delete log file %s: %s", file.path.c_str(),
+               error->localizedDescription.c_str());
+    return;
+  }
+  log_.normal("writeToLogFile: Deleted expired kytreportingd log file %s (%s)", file.path.c_str(),
+              dateText(file.creationDate).c_str());
+}
+
+}  // namespace kyt

@@ -1,0 +1,52 @@
+// The local message log as files: one line for each call, in a file that is current for a day after its
+// creation and then deleted by the next call. At most one file stays; every call lists the folder, so this is
+// for a low rate of lines. Files of other names in the folder are left alone.
+//
+// Takes no lock: each call opens, appends and closes within itself, and a line is appended in one piece, so
+// two calls at once do no more than start two files, of which the next call keeps the newer.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Value.h"
+#include "session/MessageLog.h"
+
+namespace kyt {
+
+class Clock;
+class Counters;
+class FileManager;
+class Log;
+
+class MessageLogFiles final : public MessageLog {
+ public:
+  // All that is handed in outlives the log. The folder is made when it is missing, if the system allows that.
+  MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log, Counters& counters);
+
+  // Line breaks within a line stay: they are those of texts that back ends laid out. Other control characters
+  // and invalid UTF-8 are escaped. What a client sent as it is must have been escaped by the caller.
+  void writeToLogFile(const char* format, std::initializer_list<Value> objects) override;
+
+ private:
+  struct File {
+    std::string path;
+    std::optional<Date> creationDate;
+    uint64_t size = 0;
+  };
+  [[nodiscard]] std::vector<std::string> listing();
+  [[nodiscard]] std::optional<File> currentFile();
+  [[nodiscard]] std::optional<File> newFile();
+  void deleteFile(const File& file);
+  void lineIsLost();
+  [[nodiscard]] double now() const;
+
+  const std::string folder_;
+  FileManager& files_;
+  const Clock& clock_;
+  Log& log_;
+  Counters& counters_;
+};
+
+}  // namespace kyt
