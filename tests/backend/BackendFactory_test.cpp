@@ -24,6 +24,7 @@ class BackendFactoryTest : public testing::Test {
     return {name, [this, label](const String& n, const Dictionary& profile,
                                 const std::optional<String>& family, int32_t clientType) {
               made_.push_back({label, family, clientType});
+              platform_.clock.setTimeOfDay({200, 0});  // making one takes its time
               return KYTReportingBackend::initWithName(platform_.platform, n, profile, family);
             }};
   }
@@ -75,6 +76,13 @@ TEST_F(BackendFactoryTest, TheFirstRowOfANameDecides) {
   ASSERT_EQ(made_.size(), 1u);
   EXPECT_EQ(made_[0].creator, "first");
   EXPECT_EQ(backends->find(kKYTReportingBackendDashboard)->profile(), (Dictionary{{"k", 1}}));
+}
+
+TEST_F(BackendFactoryTest, AProfileThatIsNoDictionaryIsAnEmptyOne) {
+  const std::optional<Backends> backends =
+      create(Dictionary{{kKYTReportingBackendDashboard, "profile"}}, Dictionary{});
+  ASSERT_EQ(backends->size(), 1u);
+  EXPECT_TRUE(backends->find(kKYTReportingBackendDashboard)->profile().empty());
 }
 
 TEST_F(BackendFactoryTest, AnUnknownNameIsLoggedAndTheOthersAreMade) {

@@ -40,6 +40,7 @@ TEST_F(EventFiltersTest, ARecordWithoutMethodAndStatusCountsAsZero) {
   const Array table{Dictionary{{"key", "k"}, {"action", "remove"}, {"method", 0}, {"status", 0}}};
   EXPECT_FALSE(filtered(table, {{"k", 1}}).contains("k"));
   EXPECT_TRUE(filtered(table, {{"_method", 1}, {"k", 1}}).contains("k"));
+  EXPECT_TRUE(filtered(table, {{"_status", 1}, {"k", 1}}).contains("k"));
 }
 
 TEST_F(EventFiltersTest, TheFirstMatchingFilterDecides) {

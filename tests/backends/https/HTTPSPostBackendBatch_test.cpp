@@ -74,6 +74,17 @@ TEST_F(HTTPSPostBackendBatch, WithoutUserInformationARequiringSessionBatchesEven
   EXPECT_TRUE(poster_->requests.empty());
 }
 
+TEST_F(HTTPSPostBackendBatch, ASessionThatNeedsNoUserInformationSendsAndFlushesWithoutIt) {
+  userInfo_ = std::nullopt;
+  backend().setRequireUserInfo(false);
+  inState(kBackendStateEnabled);
+  send(5);
+  EXPECT_EQ(postedRecords(), 1u);
+  backend().setBatchEvents(false);
+  send(6);
+  EXPECT_EQ(poster_->requests.size(), 2u);
+}
+
 TEST_F(HTTPSPostBackendBatch, SendsAloneWhatIsNotBatched) {
   inState(kBackendStateEnabled);
   backend().setBatchEvents(false);
@@ -200,6 +211,21 @@ TEST_F(HTTPSPostBackendBatch, AFlushWhileNotEnabledDiscardsTheBatch) {
   EXPECT_TRUE(poster_->requests.empty());
 }
 
+TEST_F(HTTPSPostBackendBatch, WhatIsNotEnabledDiscardsItsBatchBeforeItAsksForUserInformation) {
+  inState(kBackendStateHeld);
+  send(5);
+  backend().setUserInfoDict(std::nullopt);
+  EXPECT_EQ(flush().error->localizedDescription, "Nothing to flush");
+  EXPECT_EQ(dropped(Reason::batchDiscarded), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AFlushGoesToTheOrdinaryAddress) {
+  inState(kBackendStateEnabled);
+  send(5);
+  flush();
+  EXPECT_EQ(poster_->requests.at(0).url, "https://post.example.org/events");
+}
+
 TEST_F(HTTPSPostBackendBatch, ADiscardedBatchForgetsItsCounts) {
   entry_.set("event_threshold", 1);
   inState(kBackendStateHeld);
@@ -259,6 +285,23 @@ TEST_F(HTTPSPostBackendBatch, AFlushWhoseRecordsAreAllRefusedPostsNothing) {
   EXPECT_EQ(dropped(Reason::batchedEventFiltered), 1u);
   EXPECT_FALSE(backend().immutable());
   EXPECT_EQ(flush().error->localizedDescription, "Nothing to flush");
+}
+
+TEST_F(HTTPSPostBackendBatch, WhatBothListsRefuseIsNotWhitelisted) {
+  entry_.set("event_whitelist", Array{1});
+  entry_.set("event_blacklist", Array{5});
+  inState(kBackendStateEnabled);
+  send(5);
+  flush();
+  EXPECT_TRUE(logged("Dropping event with category 5 as it is not whitelisted for backend httppost"));
+  EXPECT_FALSE(logged("is blacklisted"));
+}
+
+TEST_F(HTTPSPostBackendBatch, CategoriesOfAFlushHaveSixteenBits) {
+  entry_.set("event_whitelist", Array{300, 65535});
+  inState(kBackendStateEnabled);
+  for (const uint16_t method : {300, 44, 65535}) send(method);
+  EXPECT_EQ(postedRecords(), 2u);
 }
 
 TEST_F(HTTPSPostBackendBatch, AFlushSkipsWhatTheBlacklistHolds) {
@@ -358,6 +401,15 @@ TEST_F(HTTPSPostBackendBatch, PastItsLimitDropsNewEventsAndSaysSoOnceAMinute) {
   EXPECT_EQ(postedRecords(), 40 - first);
   EXPECT_TRUE(send(1).isNull());
   EXPECT_EQ(postedRecords(), 1u);  // there is room again
+}
+
+TEST_F(HTTPSPostBackendBatch, AForcedFlushThatKeepsTheBatchMakesNoRoom) {
+  platform_.limits.maxBatchBytes = 20000;
+  entry_.set("event_threshold", 0);
+  inState(kBackendStateEnabled);
+  backend().setUserInfoDict(std::nullopt);
+  for (int i = 0; i < 40; ++i) send(5, {{"k", std::string(1000, 'x')}});
+  EXPECT_GT(dropped(Reason::batchFull), 20u);
 }
 
 TEST_F(HTTPSPostBackendBatch, CountsWhatContainersHoldTowardsItsLimit) {

@@ -4,6 +4,7 @@
 
 #include <limits>
 
+#include "backend/PayloadCompression.h"
 #include "tests/backends/https/HTTPSFixture.h"
 
 namespace kyt {
@@ -131,6 +132,15 @@ TEST_F(HTTPSPostBackendPost, ShowsAPrettyTextOnlyWithConsentOrWhereForced) {
   EXPECT_FALSE(shown(false, 1, false, 1));
 }
 
+TEST_F(HTTPSPostBackendPost, WithoutConsentAndOverrideShowsNothing) {
+  platform_.consent.setAllowed(false);
+  entry_.set("expedite", 1);
+  backend().setRequireUserInfo(false);  // the state of such a session asks for no consent
+  decided();
+  EXPECT_TRUE(send(5).isNull());
+  EXPECT_EQ(poster_->requests.size(), 1u);
+}
+
 TEST_F(HTTPSPostBackendPost, NobodyWhoAskedForNoPrettyTextPaysForOne) {
   sending();
   platform_.sink.clear();
@@ -198,6 +208,24 @@ TEST_F(HTTPSPostBackendPost, CompressesOnlyWhatGetsShorter) {
   EXPECT_EQ(poster_->requests[1].body.view(), noise);
 }
 
+TEST_F(HTTPSPostBackendPost, ABodyThatStaysAsLongGoesUncompressed) {
+  decided();
+  std::string json = "abcdefghijklmnopqrstuvwxyz0123456789";
+  while (gzipDeflate(platform_.platform, std::as_bytes(std::span(json)))->size() > json.size()) json += 'a';
+  ASSERT_EQ(gzipDeflate(platform_.platform, std::as_bytes(std::span(json)))->size(), json.size());
+  post(json);
+  EXPECT_FALSE(poster_->header(0, "Content-Encoding"));
+  EXPECT_EQ(poster_->requests[0].body.view(), json);
+}
+
+TEST_F(HTTPSPostBackendPost, MapsAnEventOnlyByMethodAndResponseCode) {
+  decided();
+  backend().postJSONMessage("{}", MessageFlag{}, 5, std::nullopt, nullptr);
+  backend().postJSONMessage("{}", MessageFlag{}, std::nullopt, 2, nullptr);
+  EXPECT_FALSE(poster_->header(0, "X-KYT-Event-Map"));
+  EXPECT_FALSE(poster_->header(1, "X-KYT-Event-Map"));
+}
+
 TEST_F(HTTPSPostBackendPost, GoesUncompressedWhenCompressionFails) {
   decided();
   platform_.deflate.faults.initialize = -4;
@@ -212,6 +240,7 @@ TEST_F(HTTPSPostBackendPost, SignsTheBodyAsItIsSent) {
   backend().setDigestKey(Data(std::string_view(key)));
   post(std::string(500, 'a'));
   const std::string_view body = poster_->requests[0].body.view();
+  EXPECT_EQ(unzipped(std::string(body)), std::string(500, 'a'));
   unsigned char digest[EVP_MAX_MD_SIZE];
   unsigned length = 0;
   HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()),

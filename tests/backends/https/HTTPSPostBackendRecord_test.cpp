@@ -95,6 +95,12 @@ TEST_F(HTTPSPostBackendRecord, FixedKeysReplaceThoseOfThePayload) {
   EXPECT_EQ(made.size(), 15u);
 }
 
+TEST_F(HTTPSPostBackendRecord, TheOneFixedKeyWithoutUnderscoreReplacesThePayloadsToo) {
+  const Dictionary made = record({{"eventTime", "now"}});
+  EXPECT_EQ(entryOf(made, "eventTime"), Value(1000000025.5));
+  EXPECT_EQ(made.size(), 15u);
+}
+
 TEST_F(HTTPSPostBackendRecord, LeavesOutWhatIsNotKnown) {
   backend().setProductVersion(std::nullopt);
   backend().setBuildVersion(std::nullopt);
@@ -112,10 +118,18 @@ TEST_F(HTTPSPostBackendRecord, SaysWhetherTheBuildIsInternal) {
 }
 
 TEST_F(HTTPSPostBackendRecord, AnImpossibleTimeIsMinusOne) {
-  backend().setStartTimestamp({0, 0});
-  backend().setStartTimestamp({std::numeric_limits<int64_t>::max(), 0});
-  EXPECT_TRUE(std::isfinite(
-      entryOf(record({}, {std::numeric_limits<int64_t>::min(), 0}), "_clientTS").doubleValue()));
+  struct Timeless final : HTTPSPostBackend {
+    Timeless(Configuration& configuration, double start)
+        : HTTPSPostBackend(configuration, "name", {}, std::nullopt) {
+      startTimeStamp_ = start;
+    }
+  };
+  for (const double start : {std::nan(""), -HUGE_VAL, HUGE_VAL}) {
+    const auto timeless = std::make_shared<Timeless>(platform_.configuration, start);
+    const Dictionary made = timeless->newEventDictfromPayload({}, {1, 0}, 5, 2, EventID{});
+    EXPECT_EQ(entryOf(made, "_clientTS"), Value(-1.0)) << start;
+    EXPECT_EQ(entryOf(made, "eventTime"), Value(-1.0)) << start;
+  }
 }
 
 TEST_F(HTTPSPostBackendRecord, DoesNotChangeThePayload) {
@@ -162,6 +176,20 @@ TEST_F(HTTPSPostBackendRecord, OfAStopMessageCarriesTheSamplingEntries) {
   EXPECT_TRUE(platform_.sink.contains(
       LogLevel::debug,
       "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary"));
+}
+
+TEST_F(HTTPSPostBackendRecord, OfAStopMessageSaysWhatTheEntryOverrides) {
+  platform_.random.setDraw(50);
+  entry_.set("override_dnu", 1);
+  entry_.set("sampling_threshold", 0.1);
+  entry_.set("override_sampling", 0.75);
+  decided();
+  send(0, {}, 2, 1);  // frees the held back end
+  backend().flushMessagesWithCompletion(nullptr);
+  const Dictionary stop = events(0).at(0);
+  EXPECT_EQ(entryOf(stop, "Opt"), Value(2));
+  EXPECT_EQ(entryOf(stop, "SamplingThreshold"), Value(0.1));
+  EXPECT_EQ(entryOf(stop, "OverrideSampling"), Value(0.75));
 }
 
 TEST_F(HTTPSPostBackendRecord, OfAStopMessageWithoutThresholdSaysMinusOne) {

@@ -344,6 +344,9 @@ TEST_F(HTTPSPostBackendState, AUserDefaultThatWasTakenAwayGivesWayToTheStorebag)
   backend().setPostURL(std::nullopt);
   EXPECT_TRUE(backend().updatePostLink(entry_));
   EXPECT_EQ(backend().postURL(), String("https://post.example.org/events"));
+  entry_.set("post_url", "https://later.example.org");
+  EXPECT_TRUE(backend().updatePostLink(entry_));  // the storebag's for good
+  EXPECT_EQ(backend().postURL(), String("https://later.example.org"));
 }
 
 TEST_F(HTTPSPostBackendState, TheCustomIdentifierIsMadeOnceForClientAndService) {
@@ -386,6 +389,62 @@ TEST_F(HTTPSPostBackendState, FollowsTheUserInformation) {
   backend().setUserInfoDict(userInfo_);
   backend().updateState();
   EXPECT_EQ(backend().state(), kBackendStateEnabled);
+}
+
+// What a decision leaves behind must not decide for the next client: entry "a" first, then entry "c".
+class HTTPSPostBackendNextClient : public HTTPSPostBackendState {
+ protected:
+  HTTPSPostBackendNextClient() { next_.set("client", "c"); }
+  int32_t decideForBoth() {
+    make({entry_, next_}).updateState();
+    backend().setUserInfoDict(
+        Dictionary{{kKYTReportingUserInfoClientName, "c"}, {kKYTReportingUserInfoServiceName, "b"}});
+    return decide();
+  }
+  Dictionary next_ = entry_;
+};
+
+TEST_F(HTTPSPostBackendNextClient, RespectsTheConsentAgain) {
+  entry_.set("override_dnu", 1);
+  decideForBoth();
+  EXPECT_EQ(backend().dnuType(), 0);
+}
+
+TEST_F(HTTPSPostBackendNextClient, HasNoOverrideOfTheSampling) {
+  platform_.random.setDraw(50);
+  for (Dictionary* entry : {&entry_, &next_}) entry->set("sampling_threshold", 0.1);
+  entry_.set("override_sampling", 0.2);
+  EXPECT_EQ(decideForBoth(), kBackendStateHeld);
+}
+
+TEST_F(HTTPSPostBackendNextClient, MayUseCellularAccessAgain) {
+  entry_.set("use_wifi_only", 1);
+  decideForBoth();
+  EXPECT_FALSE(backend().shouldUseWiFiOnly());
+}
+
+TEST_F(HTTPSPostBackendState, ABackEndThatSamplingDisablesTakesTheSettingsToo) {
+  entry_.remove("sampling_threshold");
+  entry_.set("event_threshold", 5);
+  EXPECT_EQ(decide(), kBackendStateDisabled);
+  EXPECT_EQ(backend().eventThreshold(), 5);
+  EXPECT_EQ(backend().postURL(), String("https://post.example.org/events"));
+}
+
+TEST_F(HTTPSPostBackendState, ACustomIdentifierIsMadeWheneverItsKeyIsThere) {
+  entry_.set("custom_clientId", false);
+  decide();
+  EXPECT_NE(platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b").string(), nullptr);
+}
+
+TEST_F(HTTPSPostBackendState, AFrozenStateIsNotWrittenAgain) {
+  decided();
+  send(5);
+  backend().flushMessagesWithCompletion(nullptr);
+  ASSERT_TRUE(backend().immutable());
+  platform_.executor.runAll();
+  backend().updateState();
+  EXPECT_EQ(platform_.executor.pending(), 0u);  // or it would undo what a reply sets at this moment
 }
 
 TEST_F(HTTPSPostBackendState, AFlushThatWasShownFreezesTheState) {
