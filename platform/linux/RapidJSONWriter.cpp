@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "platform/Limits.h"
+#include "platform/TextEscape.h"
 #include "platform/linux/JSONTextStream.h"
 
 namespace kyt {
@@ -156,11 +157,11 @@ class Builder {
   bool Uint64(uint64_t) { return false; }
   bool Double(double) { return false; }
   bool String(const char* text, rapidjson::SizeType length, bool) {
-    return take(Value(std::string_view(text, length)));
+    return isText({text, length}) && take(Value(std::string_view(text, length)));
   }
   bool Key(const char* text, rapidjson::SizeType length, bool) {
     open_.back().key = kyt::String(std::string_view(text, length));
-    return true;
+    return isText({text, length});
   }
   bool StartObject() { return start(Value(Dictionary())); }
   bool StartArray() { return start(Value(Array())); }
@@ -202,6 +203,12 @@ class Builder {
   }
 
   std::vector<Container> open_;
+  // The reader takes an escaped low surrogate that stands alone and makes what is no UTF-8 of it.
+  bool isText(std::string_view text) {
+    if (isValidUTF8(text)) return true;
+    error_ = "The surrogate pair in string is invalid.";
+    return false;
+  }
   Value root_;
   const char* error_ = nullptr;
 };

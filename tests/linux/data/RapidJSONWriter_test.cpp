@@ -152,5 +152,12 @@ TEST(JSON, LimitsDepth) {
   EXPECT_NE(errorOf(std::string(1000000, '[')), "no error");
 }
 
+TEST(RapidJSONWriter, RefusesEscapedSurrogatesThatStandAlone) {
+  RapidJSONWriter json;
+  for (const char* text : {R"(["\uDDDD"])", R"(["\uD800"])", R"({"\uDC00": 1})", R"(["\uD800\uD800"])"})
+    EXPECT_TRUE(std::holds_alternative<Error>(json.parse(text))) << text;
+  EXPECT_EQ(std::get<Value>(json.parse(R"(["\uD83D\uDE00"])")), Value(Array{"\xF0\x9F\x98\x80"}));
+}
+
 }  // namespace
 }  // namespace kyt
