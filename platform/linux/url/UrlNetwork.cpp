@@ -1,6 +1,7 @@
 #include "platform/linux/url/UrlNetwork.h"
 
 #include <pthread.h>
+#include <strings.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <unistd.h>
@@ -23,6 +24,12 @@ MonotonicTime currentTime() {
 
 void nameThread(const char* name) {
   pthread_setname_np(pthread_self(), name);
+}
+
+// libcurl takes an address without a scheme, or with a single slash behind it, for one over plain http: what
+// forces https by looking at the scheme would not see it.
+bool namesItsScheme(const std::string& url) {
+  return strncasecmp(url.c_str(), "http://", 7) == 0 || strncasecmp(url.c_str(), "https://", 8) == 0;
 }
 
 WorkerPoolOptions completionWorkers() {
@@ -214,6 +221,8 @@ void URLNetwork::begin(std::shared_ptr<URLTransfer> transfer) {
   begun.started = now_;
   if (begun.refused || cancelled_.load()) {
     fail(begun, kURLErrorCancelled, "The URL session was invalidated");
+  } else if (!namesItsScheme(begun.request.url)) {
+    fail(begun, CURLE_UNSUPPORTED_PROTOCOL, "The address begins neither with https:// nor with http://");
   } else {
     activate(begun);
   }

@@ -230,6 +230,19 @@ TEST_F(CurlURLSession, RefusesRequestsAfterItsInvalidation) {
   EXPECT_EQ(server_.requestCount(), 0u);
 }
 
+TEST_F(CurlURLSession, RefusesAddressesThatDoNotNameTheirScheme) {
+  auto urls = session();
+  const std::string address = "127.0.0.1:" + std::to_string(server_.port());
+  for (const std::string& url :
+       {address, "http:/" + address, "//" + address, "ftp://" + address, std::string()}) {
+    const Outcome outcome = perform(*urls, get(url));
+    EXPECT_EQ(outcome.errorCode(), CURLE_UNSUPPORTED_PROTOCOL) << url;
+    EXPECT_EQ(outcome.errorText(), "The address begins neither with https:// nor with http://") << url;
+  }
+  EXPECT_EQ(perform(*urls, get("HTTP://" + address)).status(), 200);
+  EXPECT_EQ(server_.requestCount(), 1u);
+}
+
 TEST_F(CurlURLSession, CancelsOneRequest) {
   server_.setReply(reply(Behaviour::hold));
   auto urls = session();
