@@ -53,7 +53,8 @@ bool URLNetwork::canLeave(const URLTransfer& transfer) {
 void URLNetwork::setAside(URLTransfer& transfer) {
   URLSessionState& session = *transfer.session;
   transfer.phase = URLTransfer::Phase::waiting;
-  transfer.waitingCharge = std::max(transfer.request.body.size(), kLeastCharge);
+  // Headers may be large too: they carry names that clients choose.
+  transfer.waitingCharge = std::max(transfer.request.body.size() + transfer.headerSize(), kLeastCharge);
   session.waitingBytes += transfer.waitingCharge;
   waiting_.fetch_add(1, std::memory_order_relaxed);
   waitingBodyBytes_.fetch_add(transfer.request.body.size(), std::memory_order_relaxed);

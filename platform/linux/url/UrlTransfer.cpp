@@ -139,6 +139,7 @@ void URLTransfer::buildHeaders() {
     headerList_[i] = {line, i + 1 < headerList_.size() ? &headerList_[i + 1] : nullptr};
     line += std::strlen(line) + 1;
   }
+  request.headers = {};  // the lines are what is sent, at each attempt
 }
 
 void URLTransfer::addHeader(std::string_view name, std::string_view value) {

@@ -38,6 +38,8 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   void configure(CURL* handle);
   // Forgets what an earlier attempt received.
   void clearReply();
+  // Of the request's headers, once it has been configured.
+  [[nodiscard]] size_t headerSize() const { return headerText_.size(); }
   void takeReply(int status);
   void takeError(int32_t code, std::string description);
 

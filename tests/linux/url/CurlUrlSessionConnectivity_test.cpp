@@ -176,14 +176,15 @@ TEST_F(CurlURLSessionConnectivity, DropsTheOldestWhenTooMuchOfASessionWaits) {
   Outcome unaffected;
   other->start(post(server_->url("/other"), std::string(1u << 20, 'o')), unaffected.completion());
   std::vector<Outcome> outcomes(6);
+  constexpr size_t kBody = (4u << 20) - 1024;  // and some bytes of headers
   for (size_t i = 0; i < outcomes.size(); ++i)
-    urls->start(post(server_->url("/" + std::to_string(i)), std::string(4u << 20, 'b')),
+    urls->start(post(server_->url("/" + std::to_string(i)), std::string(kBody, 'b')),
                 outcomes[i].completion());
   ASSERT_TRUE(outcomes[0].wait() && outcomes[1].wait());
   EXPECT_EQ(outcomes[0].errorCode(), kURLErrorWaitingTooMuch);
   EXPECT_EQ(outcomes[1].errorCode(), kURLErrorWaitingTooMuch);
   ASSERT_TRUE(waitUntilWaiting(5));
-  EXPECT_EQ(factory().figures().waitingBytes, 17u << 20);
+  EXPECT_EQ(factory().figures().waitingBytes, (1u << 20) + 4 * kBody);
   EXPECT_EQ(factory().figures().droppedWhileWaiting, 2u);
   EXPECT_EQ(counters_.value(Reason::waitingRequestDisplaced), 2u);
   EXPECT_EQ(sink_.count("more than 16777216 bytes wait for connectivity"), 1u);
@@ -194,6 +195,20 @@ TEST_F(CurlURLSessionConnectivity, DropsTheOldestWhenTooMuchOfASessionWaits) {
   }
   ASSERT_TRUE(unaffected.wait());
   EXPECT_EQ(unaffected.status(), 200);
+}
+
+TEST_F(CurlURLSessionConnectivity, CountsHeadersTowardsWhatWaits) {
+  auto urls = session(true);
+  std::vector<Outcome> outcomes(5);
+  for (Outcome& outcome : outcomes) {
+    URLRequest request = post(server_->url("/"), "x");
+    request.headers = {{"X-KYT-Client-Name", std::string(4u << 20, 'n')}};
+    urls->start(std::move(request), outcome.completion());
+  }
+  ASSERT_TRUE(outcomes[0].wait() && outcomes[1].wait());
+  EXPECT_EQ(outcomes[0].errorCode(), kURLErrorWaitingTooMuch);
+  EXPECT_EQ(outcomes[1].errorCode(), kURLErrorWaitingTooMuch);
+  ASSERT_TRUE(waitUntilWaiting(3));
 }
 
 TEST_F(CurlURLSessionConnectivity, WaitsWhileNoNameServerHasARoute) {
