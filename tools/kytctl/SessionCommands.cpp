@@ -1,12 +1,14 @@
 // Events by hand: one alone, or a scripted session.
 #include <unistd.h>
 
+#include <chrono>
 #include <condition_variable>
 #include <cstdio>
 #include <functional>
 #include <map>
 #include <mutex>
 #include <sstream>
+#include <thread>
 
 #include "kytreporting/KYTReporting.h"
 #include "platform/DataServices.h"
@@ -17,6 +19,9 @@
 namespace kyt::tools {
 
 namespace {
+
+constexpr uint64_t kQueued =
+    1024;  // messages that a script lets wait, well below what a session's queue holds
 
 // What a completion said, waited for by the command's own thread. Shared: the completion may come after the
 // time-out.
@@ -136,9 +141,22 @@ class Script {
                             });
       return report(answer, connection_, "send");
     }
-    for (uint32_t i = numberAt(step, "repeat", 1); i > 0; --i)
-      if (!session_->sendMessage(category, type, payload, flag)) return failed("send: the queue is full");
+    for (uint32_t i = numberAt(step, "repeat", 1); i > 0; --i) {
+      if (!waitForRoom()) return failed("send: the queue stays full");
+      if (!session_->sendMessage(category, type, payload, flag))
+        return failed("send: the message does not fit into the queue");
+    }
     return 0;
+  }
+  // A script that repeats a message more often than the session's queue holds goes on at the daemon's pace.
+  bool waitForRoom() {
+    const auto deadline =
+        std::chrono::steady_clock::now() + std::chrono::duration<double>(connection_.timeoutSeconds);
+    while (session_->statistics().queued >= kQueued) {
+      if (std::chrono::steady_clock::now() >= deadline) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return true;
   }
   int flush(const Dictionary&) {
     auto answer = std::make_shared<Answer>();
