@@ -72,10 +72,10 @@ class DaemonProcess {
     std::vector<char*> raw;
     for (std::string& argument : arguments) raw.push_back(argument.data());
     raw.push_back(nullptr);
-    const std::string logFile = root_ / "log";
+    const std::string logFile = root_.write("log", "");  // what an earlier process wrote is over
     child_ = ::fork();
     if (child_ != 0) return;
-    const int out = ::open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    const int out = ::open(logFile.c_str(), O_WRONLY | O_APPEND);
     ::dup2(out, 1);
     ::dup2(out, 2);
     if (listening_ >= 0) {
