@@ -22,20 +22,9 @@
 #include "platform/Error.h"
 #include "platform/Value.h"
 #include "platform/ipc/MessageReader.h"
+#include "platform/ipc/WireCursor.h"
 
 namespace kyt {
-
-enum class BodyStatus : uint8_t { ok, invalidArguments, malformed };
-
-// Where reading stands; the representation of BodyReader.
-struct WireCursor {
-  const uint8_t* begin;
-  const uint8_t* at;
-  const uint8_t* end;
-  bool swapped;
-  BodyStatus status = BodyStatus::ok;
-  const char* problem = nullptr;
-};
 
 class BodyReader {
  public:
