@@ -1,0 +1,182 @@
+// The whole daemon in a network of its own that the tests cut and restore: what waits for a route, and what waits for
+// another network than the cellular one.
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
+#include <string>
+
+#include "tests/integration/DaemonProcess.h"
+#include "tests/integration/TestClient.h"
+#include "tests/support/NetworkNamespace.h"
+#include "tests/support/TestHTTPServer.h"
+
+namespace kyt {
+namespace {
+
+constexpr int kTorvel = 5;
+
+// The daemon's network and the server's. The server's address lies behind a route by way of "wwan0" ("cellular") or
+// "eth7", both cables to the same machine.
+class Connectivity : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!NetworkNamespace::isPermitted()) GTEST_SKIP() << "network namespaces need root";
+    here_.emplace();
+    there_.emplace();
+    ASSERT_TRUE(here_->connect("eth7", "10.77.0.2/24", *there_, "eth8", "10.77.0.1/24"));
+    ASSERT_TRUE(here_->connect("wwan0", "10.79.0.2/24", *there_, "eth9", "10.79.0.1/24"));
+    ASSERT_TRUE(there_->run("ip addr add 10.78.0.1/24 dev eth8"));
+    {
+      const NetworkNamespace::Entered entered(*there_);
+      TestHTTPServer::Options options;
+      options.address = "10.78.0.1";
+      server_ = std::make_unique<TestHTTPServer>(options);
+    }
+    daemon_.emplace(base());
+  }
+  void TearDown() override {
+    if (!started_) return;
+    daemon_->terminate();
+    EXPECT_EQ(daemon_->exitStatus(), 0) << daemon_->log();
+  }
+  [[nodiscard]] std::string base() const { return "http://10.78.0.1:" + std::to_string(server_->port()); }
+  void startDaemon(const std::string& moreSettings = {}) {
+    daemon_->root().write("etc/kytreportingd/device.toml", "ReleaseType = \"Internal\"\ncountry = \"DE\"\n");
+    daemon_->root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml", "consent = true\n");
+    daemon_->writeSettings("[storebag]\ninternal_host = \"" + base() + "\"\npublic_host = \"" + base() +
+                           "\"\n[log]\ntarget = \"stderr\"\n" + moreSettings);
+    const NetworkNamespace::Entered entered(*here_);
+    started_ = daemon_->startAndWait();
+    ASSERT_TRUE(started_) << daemon_->log();
+  }
+  void serveBag(bool wifiOnly) {
+    const auto entry = [&](const char* name, bool only) {
+      return Dictionary{{"client", name},
+                        {"locale_whitelist", Array{"DE"}},
+                        {"filters", Array{}},
+                        {"sampling_threshold", 1.0},
+                        {"event_threshold", 1000},
+                        {"use_wifi_only", only ? 1 : 0},
+                        {"post_url", base() + "/events/" + name}};
+    };
+    const Dictionary backend{{"clients", Array{entry("choosy", wifiOnly), entry("plain", false)}}};
+    server_->setHandler(
+        [document =
+             signedBag(Dictionary{{"version", "1"}, {"vantu_internal", Dictionary{{"httppost", backend}}}},
+                       propertyLists_)](const TestHTTPServer::Request& request) {
+          TestHTTPServer::Reply reply;
+          if (request.method == "GET") reply.body = document;
+          return reply;
+        });
+  }
+  bool route(const char* change, const char* interface) {
+    const std::string gateway = interface == std::string("wwan0") ? "10.79.0.1" : "10.77.0.1";
+    return here_->run(std::string("ip route ") + change + " 10.78.0.0/24 via " + gateway + " dev " +
+                      interface);
+  }
+  // How often something in the daemon's network found no route, by the kernel's count.
+  long refusedByTheKernel() {
+    const NetworkNamespace::Entered entered(*here_);
+    std::ifstream file("/proc/thread-self/net/snmp");
+    std::string names, values;
+    while (std::getline(file, names) && std::getline(file, values) && names.rfind("Ip:", 0) != 0) {
+    }
+    std::istringstream name(names), value(values);
+    for (std::string n, v; name >> n && value >> v;)
+      if (n == "OutNoRoutes") return std::stol(v);
+    return -1;
+  }
+  size_t posts(const std::string& client) {
+    size_t count = 0;
+    for (const auto& request : server_->requests())
+      count += request.method == "POST" && request.target == "/events/" + client ? 1 : 0;
+    return count;
+  }
+  static bool isOpen(const std::shared_future<std::string>& answer) {
+    return answer.wait_for(std::chrono::seconds(0)) != std::future_status::ready;
+  }
+
+  PugixmlPropertyLists propertyLists_;
+  std::optional<NetworkNamespace> here_, there_;
+  std::unique_ptr<TestHTTPServer> server_;
+  std::optional<DaemonProcess> daemon_;
+  bool started_ = false;
+};
+
+TEST_F(Connectivity, EventsWaitWhileThereIsNoRouteAndArriveWhenItIsBack) {
+  ASSERT_TRUE(route("add", "eth7"));
+  serveBag(false);
+  startDaemon();
+  ASSERT_TRUE(there_->run("ip route add default via 10.77.0.2"));
+  TestClient client(daemon_->socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_->log();
+  ASSERT_TRUE(route("del", "eth7"));
+  server_->closeConnections();
+  ASSERT_TRUE(server_->waitForConnectionsOpen(0));
+  for (int i = 0; i < 3; ++i) {
+    const long refused = refusedByTheKernel();
+    ASSERT_GE(refused, 0);
+    EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", i}}));
+    const std::shared_future<std::string> answer = client.startFlush()->get_future().share();
+    ASSERT_TRUE(eventually([&] { return refusedByTheKernel() > refused; })) << "the daemon tried";
+    EXPECT_NE(client.displayURL(), "no answer") << "the session goes on";
+    EXPECT_TRUE(isOpen(answer));
+    EXPECT_EQ(posts("plain"), static_cast<size_t>(i));
+    ASSERT_TRUE(route("add", "eth7"));
+    ASSERT_EQ(answer.wait_for(kTestDeadline), std::future_status::ready);
+    EXPECT_EQ(answer.get(), "flushed");
+    EXPECT_EQ(posts("plain"), static_cast<size_t>(i) + 1);
+    ASSERT_TRUE(route("del", "eth7"));
+    server_->closeConnections();
+    ASSERT_TRUE(server_->waitForConnectionsOpen(0));
+  }
+  ASSERT_TRUE(route("add", "eth7"));
+}
+
+TEST_F(Connectivity, EventsThatMayNotUseACellularInterfaceWaitForAnother) {
+  ASSERT_TRUE(route("add", "wwan0"));
+  ASSERT_TRUE(there_->run("ip route add default via 10.79.0.2"));
+  serveBag(true);
+  startDaemon("[network]\ncellular_interfaces = [\"wwan*\"]\n");
+  TestClient choosy(daemon_->socketPath(), kTorvel, "choosy"), plain(daemon_->socketPath(), kTorvel, "plain");
+  ASSERT_EQ(choosy.configure(), "live: httppost") << "a bag comes by any network" << daemon_->log();
+  ASSERT_EQ(plain.configure(), "live: httppost");
+  EXPECT_TRUE(choosy.send(9, 1, Dictionary{{"k", 1}}));
+  const std::shared_future<std::string> answer = choosy.startFlush()->get_future().share();
+  // Answered after the flush was handed over.
+  EXPECT_NE(choosy.displayURL(), "no answer");
+  EXPECT_TRUE(plain.send(9, 1, Dictionary{{"k", 1}}));
+  EXPECT_EQ(plain.flush(), "flushed") << daemon_->log();
+  EXPECT_EQ(posts("plain"), 1U);
+  EXPECT_TRUE(isOpen(answer));
+  EXPECT_EQ(posts("choosy"), 0U);
+
+  ASSERT_TRUE(route("replace", "eth7"));
+  ASSERT_EQ(answer.wait_for(kTestDeadline), std::future_status::ready);
+  EXPECT_EQ(answer.get(), "flushed") << daemon_->log();
+  EXPECT_EQ(posts("choosy"), 1U);
+}
+
+TEST_F(Connectivity, WhatStillWaitsIsGivenUpWhenTheDaemonEnds) {
+  ASSERT_TRUE(route("add", "eth7"));
+  ASSERT_TRUE(there_->run("ip route add default via 10.77.0.2"));
+  serveBag(false);
+  startDaemon("[service]\nshutdown_grace_seconds = 0.5\n");
+  TestClient client(daemon_->socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_->log();
+  ASSERT_TRUE(route("del", "eth7"));
+  server_->closeConnections();
+  ASSERT_TRUE(server_->waitForConnectionsOpen(0));
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"k", 1}}));
+  const auto begin = std::chrono::steady_clock::now();
+  daemon_->terminate();
+  EXPECT_EQ(daemon_->exitStatus(), 0);
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(5));
+  EXPECT_TRUE(daemon_->logged("shutDown: Cancelling 1 requests that have not been answered in time"))
+      << daemon_->log();
+  started_ = false;
+}
+
+}  // namespace
+}  // namespace kyt
