@@ -175,7 +175,7 @@ class SDBusClient {
   }
   // The reply; its error's name and text end the test otherwise.
   Message call(const Message& message) {
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error = {};
     sd_bus_message* reply = nullptr;
     EXPECT_GE(sd_bus_call(bus_.get(), message.get(), 30u * 1000 * 1000, &error, &reply), 0)
         << (error.name != nullptr ? error.name : "") << " "
