@@ -1,0 +1,296 @@
+// kytctl as a person or a script runs it, beside a real daemon where it needs one.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+
+#include "tests/integration/StageFixture.h"
+
+namespace kyt {
+namespace {
+
+const std::string kTool = std::string(KYT_PROGRAMS) + "/kytctl";
+
+bool has(const std::string& text, const std::string& part) {
+  return text.find(part) != std::string::npos;
+}
+
+class KytctlOnAStage : public StageTest {
+ protected:
+  void SetUp() override {
+    lay();
+    putBag("dulvek", {entry("person")});
+    startDaemon();
+  }
+};
+
+TEST_F(KytctlOnAStage, SendsOneEvent) {
+  const ProgramRun sent = kytctl({"send", "--client-type", "8", "--session-id", "5", "--category", "3",
+                                  "--type", "4", "--payload", R"({"text":"hello","number":7})",
+                                  "--require-user-info", "--user-info", R"({"ClientName":"person"})"});
+  EXPECT_EQ(sent.status, 0) << sent.text;
+  EXPECT_EQ(sent.text, "finished\n");
+  EXPECT_TRUE(arrive("client=person&method=3&status=4", 1)) << daemonLog();
+}
+
+TEST_F(KytctlOnAStage, SaysWhenAnEventWasNotSent) {
+  // No storebag belongs to client type 0.
+  const ProgramRun sent =
+      kytctl({"send", "--client-type", "0", "--category", "3", "--type", "4", "--payload", "{}"});
+  EXPECT_EQ(sent.status, 1);
+  EXPECT_NE(sent.text, "");
+  EXPECT_FALSE(has(sent.text, "finished\n")) << sent.text;
+}
+
+TEST_F(KytctlOnAStage, SendRefusesWhatIsNoJSONObject) {
+  for (const char* payload : {"[]", "{", "7"}) {
+    const ProgramRun sent =
+        kytctl({"send", "--client-type", "8", "--category", "3", "--type", "4", "--payload", payload});
+    EXPECT_EQ(sent.status, 1) << payload;
+    EXPECT_TRUE(has(sent.text, "kytctl: --payload")) << sent.text;
+  }
+  const ProgramRun user = kytctl({"send", "--client-type", "8", "--category", "3", "--type", "4", "--payload",
+                                  "{}", "--user-info", "[]"});
+  EXPECT_EQ(user.status, 1);
+  EXPECT_TRUE(has(user.text, "kytctl: --user-info is a JSON object")) << user.text;
+}
+
+TEST_F(KytctlOnAStage, RunsAScriptedSessionFromAFileOrFromStandardInput) {
+  const std::string script =
+      "# a comment, and an empty line\n\n"
+      R"({"do":"open","sessionInfo":{"SessionID":6,"ClientType":8,"BatchEvent":true,"RequireUserInfo":true},"userInfo":{"ClientName":"person"}})"
+      "\n"
+      R"({"do":"configure"})"
+      "\n"
+      R"({"do":"states","userInfo":{"ClientName":"person"}})"
+      "\n"
+      R"({"do":"displayURL"})"
+      "\n"
+      R"({"do":"send","category":3,"type":1,"payload":{"k":1},"repeat":6000})"
+      "\n"
+      R"({"do":"flush"})"
+      "\n"
+      R"({"do":"sharedData","entries":{"a":1,"b":null}})"
+      "\n"
+      R"({"do":"digestKey","hex":"00ff","algorithm":0})"
+      "\n"
+      R"({"do":"finish"})"
+      "\n";
+  const ProgramRun run = kytctl({"session", "-"}, script);
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_TRUE(has(run.text, "live: httppost\nlive: httppost\nhttps://display.example.org/\n")) << run.text;
+  EXPECT_TRUE(has(run.text, "sent 60")) << run.text;
+  EXPECT_TRUE(has(run.text, "lost 0, dropped 0\n")) << run.text;
+  EXPECT_TRUE(arrive("client=person&method=3", 6000)) << daemonLog();
+  ASSERT_FALSE(tools::writeFile(stage_->folder() + "/script", script, 0644));
+  EXPECT_EQ(kytctl({"session", stage_->folder() + "/script"}).status, 0);
+  EXPECT_TRUE(arrive("client=person&method=3", 12000));
+}
+
+TEST_F(KytctlOnAStage, AWrongScriptEndsAtItsLine) {
+  const std::pair<const char*, const char*> scripts[] = {
+      {"{\"do\":\"configure\"}\n", "the first step is {\"do\":\"open\"}"},
+      {"{\"do\":\"dance\"}\n", "unknown step \"dance\""},
+      {"{\"what\":1}\n", "a step needs \"do\""},
+      {"\n[1]\n", "line 2: a step is a JSON object"},
+      {"{\"do\":\n", "line 1: "},
+      {"{\"do\":\"open\",\"sessionInfo\":{\"ClientType\":8}}\n{\"do\":\"digestKey\",\"hex\":\"zz\"}\n",
+       "is no hex"}};
+  for (const auto& [script, complaint] : scripts) {
+    const ProgramRun run = kytctl({"session", "-"}, script);
+    EXPECT_EQ(run.status, 1) << script;
+    EXPECT_TRUE(has(run.text, complaint)) << run.text;
+  }
+  const ProgramRun missing = kytctl({"session", stage_->folder() + "/no such script"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_TRUE(has(missing.text, "no such script")) << missing.text;
+}
+
+// Without a daemon.
+class Kytctl : public ::testing::Test {
+ protected:
+  [[nodiscard]] ProgramRun run(std::vector<std::string> arguments, const std::string& input = {}) const {
+    arguments.insert(arguments.begin(), {"--root", folder_.path()});
+    return runProgram(kTool, arguments, input);
+  }
+  void SetUp() override { std::filesystem::create_directories(folder_ / "var/lib/kytreportingd/defaults"); }
+  // Keys, and a bag that is fine.
+  void makeKeys() {
+    ASSERT_EQ(run({"keys", "make", folder_ / "keys"}).status, 0);
+    bag_ = folder_.write(
+        "bag.json",
+        R"({"version":"7","release":{"httppost":{"clients":[{"client":"a","locale_whitelist":["DE"],)"
+        R"("filters":[],"sampling_threshold":1.0,"event_threshold":10,"post_url":"https://h/e"}]}}})");
+  }
+  [[nodiscard]] ProgramRun sign(const std::string& bag, const std::string& output) const {
+    return run({"storebag", "sign", bag, "--key", folder_ / "keys/private.pem", "-o", output});
+  }
+
+  TemporaryFolder folder_;
+  std::string bag_;
+};
+
+TEST_F(Kytctl, SaysHowItIsUsed) {
+  EXPECT_EQ(run({}).status, 2);
+  EXPECT_EQ(run({"no-such-command"}).status, 2);
+  EXPECT_EQ(run({"send", "--category", "3"}).status, 2) << "arguments are missing";
+  const ProgramRun help = run({"--help"});
+  EXPECT_EQ(help.status, 0);
+  for (const char* command : {"send", "session", "defaults", "consent", "keys", "storebag"})
+    EXPECT_TRUE(has(help.text, command)) << command;
+}
+
+TEST_F(Kytctl, GivesUpWithoutADaemon) {
+  const ProgramRun sent =
+      run({"send", "--timeout", "0.2", "--client-type", "8", "--category", "1", "--type", "1"});
+  EXPECT_EQ(sent.status, 1);
+  EXPECT_TRUE(has(sent.text, "kytctl: send: ")) << sent.text;
+}
+
+TEST_F(Kytctl, WritesReadsAndDeletesUserDefaults) {
+  const std::string domain = "com.vantu.kytreporting";
+  const auto write = [&](const std::string& key, const std::string& type, const std::string& value) {
+    return run({"defaults", "write", domain, key, "--type", type, "--", value}).status;
+  };
+  EXPECT_EQ(write("environmentType", "integer", "2"), 0);
+  EXPECT_EQ(write("httpsPostURL", "string", "https://h/e"), 0);
+  EXPECT_EQ(write("forceEventLogging", "boolean", "true"), 0);
+  EXPECT_EQ(write("ratio", "real", "-0.5"), 0);
+  EXPECT_EQ(run({"defaults", "read", domain, "environmentType"}).text, "2\n");
+  EXPECT_EQ(run({"defaults", "read", domain, "ratio"}).text, "-0.5\n");
+  const ProgramRun all = run({"defaults", "read", domain});
+  EXPECT_EQ(all.status, 0);
+  EXPECT_TRUE(has(all.text, "environmentType = 2 (integer)\n")) << all.text;
+  EXPECT_TRUE(has(all.text, "httpsPostURL = https://h/e (string)\n")) << all.text;
+  EXPECT_TRUE(has(all.text, "(boolean)\n")) << all.text;
+  EXPECT_TRUE(has(all.text, "ratio = -0.5 (real)\n")) << all.text;
+  EXPECT_EQ(run({"defaults", "delete", domain, "environmentType"}).status, 0);
+  const ProgramRun gone = run({"defaults", "read", domain, "environmentType"});
+  EXPECT_EQ(gone.status, 1);
+  EXPECT_TRUE(has(gone.text, "has no value for environmentType")) << gone.text;
+}
+
+TEST_F(Kytctl, RefusesUserDefaultsThatAreNone) {
+  const std::string domain = "com.vantu.kytreporting";
+  EXPECT_EQ(run({"defaults", "write", domain, "k", "--type", "integer", "2x"}).status, 1);
+  EXPECT_EQ(run({"defaults", "write", domain, "k", "--type", "boolean", "perhaps"}).status, 1);
+  EXPECT_EQ(run({"defaults", "write", domain, "k", "--type", "real", ""}).status, 1);
+  EXPECT_EQ(run({"defaults", "write", domain, "k", "--type", "colour", "red"}).status, 2);
+  EXPECT_EQ(run({"defaults", "write", "../../../etc/x", "k", "v"}).status, 1);
+  EXPECT_EQ(run({"defaults", "read", "a/b"}).status, 1);
+  EXPECT_EQ(run({"defaults"}).status, 2);
+}
+
+TEST_F(Kytctl, ShowsGrantsAndWithdrawsConsent) {
+  EXPECT_EQ(run({"consent", "show"}).text, "consent to diagnostics-and-usage upload: not given\n")
+      << "no value is no";
+  const ProgramRun granted = run({"consent", "grant"});
+  EXPECT_EQ(granted.status, 0);
+  EXPECT_EQ(granted.text, "consent to diagnostics-and-usage upload: granted\n");
+  EXPECT_EQ(run({"consent", "show"}).text, granted.text);
+  EXPECT_EQ(run({"consent", "withdraw"}).text, "consent to diagnostics-and-usage upload: not given\n");
+  EXPECT_EQ(run({"consent"}).status, 2);
+}
+
+TEST_F(Kytctl, MakesKeysThatOnlyTheirOwnerReads) {
+  const ProgramRun made = run({"keys", "make", folder_ / "keys"});
+  EXPECT_EQ(made.status, 0) << made.text;
+  EXPECT_EQ(made.text, folder_ / "keys/private.pem" + "\n" + (folder_ / "keys/publicKey.der") + "\n");
+  struct stat info {};
+  ASSERT_EQ(::stat((folder_ / "keys/private.pem").c_str(), &info), 0);
+  EXPECT_EQ(info.st_mode & 0777U, 0600U);
+  EXPECT_EQ(run({"keys", "make", folder_ / "small", "--bits", "1024"}).status, 1);
+  EXPECT_EQ(run({"keys", "make", folder_ / "no/such/folder"}).status, 1);
+}
+
+TEST_F(Kytctl, SignsVerifiesAndShowsAStorebag) {
+  makeKeys();
+  const std::string document = folder_ / "document";
+  const ProgramRun signed_ = sign(bag_, document);
+  EXPECT_EQ(signed_.status, 0);
+  EXPECT_EQ(signed_.text, "") << "nothing in this bag surprises";
+  const ProgramRun verified =
+      run({"storebag", "verify", document, "--public-key", folder_ / "keys/publicKey.der"});
+  EXPECT_EQ(verified.status, 0);
+  EXPECT_EQ(verified.text, document + ": the signature holds; version 7\n");
+  const ProgramRun shown = run({"storebag", "show", document});
+  EXPECT_EQ(shown.status, 0);
+  EXPECT_TRUE(has(shown.text, "\"post_url\": \"https://h/e\"")) << shown.text;
+  const ProgramRun printed = sign(bag_, "-");
+  EXPECT_EQ(printed.text, folder_.read("document")) << "the same signature each time";
+}
+
+TEST_F(Kytctl, SignsBagsInEachFormatAlike) {
+  makeKeys();
+  const std::string toml = folder_.write("bag.toml", "version = \"7\"\n[release.httppost]\n");
+  const std::string plist = folder_.write(
+      "bag.plist",
+      "<plist version=\"1.0\"><dict><key>version</key><string>7</string><key>release</key><dict>"
+      "<key>httppost</key><dict/></dict></dict></plist>");
+  ASSERT_EQ(sign(toml, folder_ / "a").status, 0);
+  ASSERT_EQ(sign(plist, folder_ / "b").status, 0);
+  EXPECT_EQ(folder_.read("a"), folder_.read("b"));
+  const std::string other = folder_.write("bag.yaml", "version: 7\n");
+  const ProgramRun refused = sign(other, folder_ / "c");
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_TRUE(has(refused.text, "a bag is .json, .toml or .plist")) << refused.text;
+}
+
+TEST_F(Kytctl, VerifyFindsEachKindOfForgery) {
+  makeKeys();
+  const std::string document = folder_ / "document", key = folder_ / "keys/publicKey.der";
+  ASSERT_EQ(sign(bag_, document).status, 0);
+  ASSERT_EQ(run({"keys", "make", folder_ / "others"}).status, 0);
+  const ProgramRun otherKey =
+      run({"storebag", "verify", document, "--public-key", folder_ / "others/publicKey.der"});
+  EXPECT_EQ(otherKey.status, 1);
+  EXPECT_TRUE(has(otherKey.text, "the signature does not match the bag and this key")) << otherKey.text;
+  std::string changed = folder_.read("document");
+  const size_t at = changed.find("<string>", changed.find("<key>bag</key>")) + 30;
+  changed[at] = changed[at] == 'A' ? 'B' : 'A';
+  EXPECT_EQ(run({"storebag", "verify", folder_.write("changed", changed), "--public-key", key}).status, 1);
+  EXPECT_EQ(run({"storebag", "verify", folder_.write("none", "no document"), "--public-key", key}).status, 1);
+  EXPECT_EQ(run({"storebag", "verify", folder_ / "missing", "--public-key", key}).status, 1);
+  EXPECT_EQ(run({"storebag", "verify", document, "--public-key", bag_}).status, 1);
+  EXPECT_EQ(run({"storebag", "verify", document}).status, 2) << "the key is required";
+}
+
+TEST_F(Kytctl, SignRefusesWhatNoDaemonTakes) {
+  makeKeys();
+  const ProgramRun noVersion = sign(folder_.write("a.json", "{\"release\":{}}"), folder_ / "x");
+  EXPECT_EQ(noVersion.status, 1);
+  EXPECT_TRUE(has(noVersion.text, "a bag needs a \"version\" text")) << noVersion.text;
+  EXPECT_EQ(sign(folder_.write("b.json", "[]"), folder_ / "x").status, 1);
+  EXPECT_EQ(sign(folder_.write("c.json", "{"), folder_ / "x").status, 1);
+  EXPECT_EQ(run({"storebag", "sign", bag_, "--key", bag_, "-o", folder_ / "x"}).status, 1) << "no key";
+  EXPECT_FALSE(std::filesystem::exists(folder_ / "x"));
+}
+
+TEST_F(Kytctl, WarnsAboutWhatMaySurprise) {
+  makeKeys();
+  const std::string bag = folder_.write(
+      "surprising.json",
+      R"({"version":"1","refresh_cycle":100000,"release":{"httppost":{"clients":[)"
+      R"({"filters":[{"key":"k","action":"Remove"},{"action":"remove"},{"key":"k","action":"remove","method":1}]},7]},)"
+      R"("qrs":{}}})");
+  const ProgramRun signed_ = sign(bag, folder_ / "document");
+  EXPECT_EQ(signed_.status, 0) << "warnings forbid nothing";
+  const ProgramRun shown = run({"storebag", "show", folder_ / "document"});
+  EXPECT_EQ(shown.status, 0);
+  for (const ProgramRun* run : {&signed_, &shown}) {
+    const std::string& text = run->text;
+    EXPECT_TRUE(has(text, "warning: \"refresh_cycle\" is over 86400 seconds")) << text;
+    EXPECT_TRUE(has(text, "warning: release/httppost, client 0: no \"locale_whitelist\"")) << text;
+    EXPECT_TRUE(has(text, "client 0: no \"sampling_threshold\"")) << text;
+    EXPECT_TRUE(has(text, "client 0: no \"post_url\"")) << text;
+    EXPECT_TRUE(has(text, "client 0: no \"event_threshold\"")) << text;
+    EXPECT_TRUE(has(text, "client 0, filter 0: the action is neither")) << text;
+    EXPECT_TRUE(has(text, "client 0, filter 1: no \"key\"")) << text;
+    EXPECT_TRUE(has(text, "client 0, filter 2: bound to a method or status")) << text;
+    EXPECT_TRUE(has(text, "client 1: not a dictionary")) << text;
+    EXPECT_TRUE(has(text, "release/qrs: no \"clients\" array")) << text;
+  }
+}
+
+}  // namespace
+}  // namespace kyt
