@@ -46,6 +46,17 @@ TEST_F(HTTPSPostBackendBatch, AnUndecidedBackEndBatchesWhateverTheFlag) {
   EXPECT_EQ(postedRecords(), 4u);
 }
 
+TEST_F(HTTPSPostBackendBatch, SaysWhetherAnEventIsRealtime) {
+  backend();
+  for (const auto& [flag, line] :
+       {std::pair(0, "realtime is 0"), std::pair(1, "realtime is 1"), std::pair(2, "realtime is 0"),
+        std::pair(3, "realtime is 1"), std::pair(7, "realtime is 0")}) {
+    platform_.sink.clear();
+    send(5, {}, flag);
+    EXPECT_TRUE(logged((std::string("HTTPSPostBackend(sendMessage): ") + line).c_str())) << flag;
+  }
+}
+
 TEST_F(HTTPSPostBackendBatch, AnExpediteMessageFreesAHeldBackEndAndIsItselfBatched) {
   inState(kBackendStateHeld);
   send(5);

@@ -188,6 +188,14 @@ TEST_F(HTTPSPostBackendPost, LeavesOutHeadersThatDoNotApply) {
   EXPECT_EQ(poster_->header(0, "Content-Length"), "2");
 }
 
+TEST_F(HTTPSPostBackendPost, ClientVersionsHaveSixteenBits) {
+  sending();
+  backend().setClientVersion(65535);
+  send(5);
+  EXPECT_EQ(poster_->header(0, "X-KYT-Client-Version"), "65535");
+  EXPECT_EQ(*events(0).at(0).find("_clientVersion"), Value(65535));
+}
+
 TEST_F(HTTPSPostBackendPost, AWiFiOnlyBackEndForbidsCellularAccess) {
   entry_.set("use_wifi_only", 1);
   decided();
