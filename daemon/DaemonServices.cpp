@@ -98,24 +98,10 @@ DaemonServices::DaemonServices(Start start)
       daemonBundle_(start.paths.daemonBundle(), log_),
       entitlements_(entitlementsOptions(start.paths), start.inspector, log_, counters_),
       urlSessions_(urlSessionOptions(settings_), log_, counters_),
-      platform_{settings_.limits,
-                counters_,
-                log_,
-                clock_,
-                *reactor_,
-                workers_,
-                random_,
-                userDefaults_,
-                deviceProperties_,
-                consent_,
-                cryptography_,
-                propertyLists_,
-                json_,
-                deflate_,
-                memory_,
-                urlSessions_,
-                clientBundle_,
-                daemonBundle_},
+      platform_{settings_.limits, counters_,     log_,           clock_,        *reactor_,
+                *reactor_,        workers_,      random_,        userDefaults_, deviceProperties_,
+                consent_,         cryptography_, propertyLists_, json_,         deflate_,
+                memory_,          urlSessions_,  udpSockets_,    clientBundle_, daemonBundle_},
       deviceIdentity_(platform_),
       environment_(platform_, deviceIdentity_,
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
@@ -140,9 +126,14 @@ void DaemonServices::resume() {
   listener_.resume();
 }
 
+// Requests, and datagrams that are still sent again, may outlive their session.
+bool DaemonServices::isOutstanding() const {
+  return urlSessions_.outstanding() != 0 || udpSockets_.openSockets() != 0;
+}
+
 // The idle time counts anew from the end of what a session left behind.
 bool DaemonServices::isIdle() {
-  if (agent_.sessionCount() != 0 || urlSessions_.outstanding() != 0) return false;
+  if (agent_.sessionCount() != 0 || isOutstanding()) return false;
   idle_();
   return true;
 }
@@ -171,12 +162,13 @@ void DaemonServices::endSessions(const Deadline& deadline) {
 }
 
 void DaemonServices::waitForRequests(const Deadline& deadline) {
-  const auto done = [this] { return urlSessions_.outstanding() == 0; };
+  const auto done = [this] { return !isOutstanding(); };
   if (deadline.waitUntil(done)) return;
+  if (urlSessions_.outstanding() == 0) return;  // datagrams that nobody has acknowledged are given up
   log_.error("shutDown: Cancelling %zu requests that have not been answered in time",
              urlSessions_.outstanding());
   urlSessions_.cancelAll();
-  static_cast<void>(deadline.waitUntil(done, kCancelGrace));
+  static_cast<void>(deadline.waitUntil([this] { return urlSessions_.outstanding() == 0; }, kCancelGrace));
 }
 
 void DaemonServices::logFigures() {

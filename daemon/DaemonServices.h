@@ -30,6 +30,7 @@
 #include "platform/linux/ZlibDeflate.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
+#include "platform/linux/base/LinuxUDPSocket.h"
 #include "platform/linux/system/LinuxDeviceProperties.h"
 #include "platform/linux/system/LinuxFileManager.h"
 #include "platform/linux/system/ProgramInspector.h"
@@ -70,6 +71,7 @@ class DaemonServices {
  private:
   class Deadline;
   [[nodiscard]] bool isIdle();
+  [[nodiscard]] bool isOutstanding() const;
   void endSessions(const Deadline& deadline);
   void waitForRequests(const Deadline& deadline);
   void logFigures();
@@ -93,6 +95,7 @@ class DaemonServices {
   TomlBundle clientBundle_, daemonBundle_;
   TomlEntitlements entitlements_;
   CurlURLSessionFactory urlSessions_;
+  LinuxUDPSocketFactory udpSockets_;
   Platform platform_;
 
   DeviceIdentity deviceIdentity_;

@@ -17,7 +17,9 @@ class Log;
 class MemoryInfo;
 class PropertyLists;
 class RandomSource;
+class Reactor;
 class TimerService;
+class UDPSocketFactory;
 class URLSessionFactory;
 class UserDefaults;
 struct Limits;
@@ -28,6 +30,7 @@ struct Platform {
   Log& log;
   Clock& clock;
   TimerService& timers;
+  Reactor& reactor;
   Executor& executor;
   RandomSource& random;
   UserDefaults& userDefaults;
@@ -39,6 +42,7 @@ struct Platform {
   Deflate& deflate;
   MemoryInfo& memory;
   URLSessionFactory& urlSessions;
+  UDPSocketFactory& udpSockets;
   Bundle& clientBundle;  // KYTReporting.bundle: version, publicKey.der
   Bundle& daemonBundle;  // kytreportingd.bundle: version
 };

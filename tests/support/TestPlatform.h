@@ -13,6 +13,7 @@
 #include "platform/fake/FakeBundle.h"
 #include "platform/fake/FakeConsent.h"
 #include "platform/fake/FakeDeviceProperties.h"
+#include "platform/fake/FakeUDPSocket.h"
 #include "platform/fake/FakeUrlSession.h"
 #include "platform/fake/FakeUserDefaults.h"
 #include "platform/fake/FaultyDeflate.h"
@@ -21,6 +22,7 @@
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
 #include "platform/fake/MemoryLogSink.h"
+#include "platform/fake/MemoryStream.h"
 #include "platform/linux/LinuxMemoryInfo.h"
 #include "platform/linux/OpenSSLCryptography.h"
 #include "platform/linux/PugixmlPropertyLists.h"
@@ -36,6 +38,7 @@ struct TestPlatform {
   Log log{sink, LogLevel::debug};
   ManualClock clock;
   ManualTimers timers{clock};
+  ManualReactor reactor;
   ManualExecutor executor;
   FixedRandom random;
   FakeUserDefaults userDefaults;
@@ -48,12 +51,13 @@ struct TestPlatform {
   FaultyDeflate deflate{&zlib};
   LinuxMemoryInfo memory;
   FakeURLSessionFactory urlSessions;
+  FakeUDPSockets udpSockets;
   FakeBundle clientBundle, daemonBundle;
 
-  Platform platform{
-      limits,       counters,         log,          clock,        timers,        executor, random,
-      userDefaults, deviceProperties, consent,      cryptography, propertyLists, json,     deflate,
-      memory,       urlSessions,      clientBundle, daemonBundle};
+  Platform platform{limits,  counters,     log,           clock,        timers,
+                    reactor, executor,     random,        userDefaults, deviceProperties,
+                    consent, cryptography, propertyLists, json,         deflate,
+                    memory,  urlSessions,  udpSockets,    clientBundle, daemonBundle};
 
   DeviceIdentity deviceIdentity{platform};
   Environment environment{platform, deviceIdentity,
