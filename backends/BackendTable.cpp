@@ -1,5 +1,6 @@
 #include "backends/BackendTable.h"
 
+#include "backends/dashboard/DashboardBackend.h"
 #include "backends/https/HTTPSPostBackend.h"
 #include "platform/Keys.h"
 
@@ -11,7 +12,13 @@ std::vector<BackendCreator> backendTable(Configuration& configuration) {
                        const std::optional<String>& productFamily, int32_t) {
         return HTTPSPostBackend::initWithName(configuration, name, profile, productFamily);
       };
+  const BackendCreator::Create newDashboardBackend =
+      [&configuration](const String& name, const Dictionary& profile,
+                       const std::optional<String>& productFamily, int32_t) {
+        return DashboardBackend::initWithName(configuration.platform, name, profile, productFamily);
+      };
   return {
+      {kKYTReportingBackendDashboard, newDashboardBackend},
       {kKYTReportingBackendHTTPPost, newHTTPSPostBackend},
       {kKYTReportingBackendHTTPPost2, newHTTPSPostBackend},
       {kKYTReportingBackendQRS, newHTTPSPostBackend},

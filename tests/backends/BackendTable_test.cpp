@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include "backends/dashboard/DashboardBackend.h"
 #include "backends/https/HTTPSPostBackend.h"
 #include "platform/Keys.h"
 #include "tests/support/TestPlatform.h"
@@ -26,6 +27,29 @@ TEST(BackendTable, ThreeNamesStandForTheHTTPSBackEndEachWithItsOwnProfile) {
     EXPECT_EQ(backend->name(), name);
     EXPECT_EQ(backend->displayURL(), String("https://" + name.str()));
   }
+}
+
+TEST(BackendTable, TheDashboardHasAClassOfItsOwnAndComesFirst) {
+  TestPlatform platform;
+  EXPECT_EQ(backendTable(platform.configuration).front().name, kKYTReportingBackendDashboard);
+  DefaultBackendFactory factory(platform.configuration, backendTable(platform.configuration));
+  const Dictionary table{{kKYTReportingBackendHTTPPost, Dictionary{{"clients", Array{}}}},
+                         {kKYTReportingBackendDashboard, Dictionary{{"ip", "192.0.2.7"}, {"port", 4000}}}};
+  const auto backends = factory.createBackends(table, Dictionary{}, std::nullopt, "");
+  ASSERT_TRUE(backends);
+  ASSERT_EQ(backends->size(), 2u);
+  EXPECT_NE(dynamic_cast<HTTPSPostBackend*>(backends->find(kKYTReportingBackendHTTPPost)), nullptr);
+  EXPECT_NE(dynamic_cast<DashboardBackend*>(backends->find(kKYTReportingBackendDashboard)), nullptr);
+}
+
+TEST(BackendTable, ADashboardWithoutAServerIsNoBackEnd) {
+  TestPlatform platform;
+  DefaultBackendFactory factory(platform.configuration, backendTable(platform.configuration));
+  const auto backends = factory.createBackends(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}},
+                                               Dictionary{}, std::nullopt, "");
+  ASSERT_TRUE(backends);
+  EXPECT_TRUE(backends->empty());
+  EXPECT_TRUE(platform.sink.contains("DashboardBackend(initWithName): can't resolve server IP"));
 }
 
 TEST(BackendTable, AProfileThatIsNoDictionaryMakesNoBackEnd) {

@@ -1,0 +1,232 @@
+#include "backends/dashboard/DashboardBackend.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <new>
+#include <vector>
+
+#include "config/ClientTypes.h"
+#include "platform/IPv4Address.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr Duration kDefaultPeriod = std::chrono::milliseconds(500);
+constexpr int32_t kShortestPeriod = 10;  // milliseconds; a shorter one would only keep the daemon awake
+constexpr Duration kLeeway = std::chrono::milliseconds(100);
+constexpr size_t kMaxAddressText = 16;
+
+const String* textOf(const Dictionary& profile, const char* key) {
+  const Value* value = profile.find(key);
+  return value != nullptr ? value->string() : nullptr;
+}
+
+bool has(const Dictionary& profile, const char* key) {
+  const Value* value = profile.find(key);
+  return value != nullptr && !value->isNull();
+}
+
+uint16_t portOf(const Dictionary& profile) {
+  const Value* port = profile.find("port");
+  return port != nullptr ? static_cast<uint16_t>(port->intValue()) : uint16_t{0};
+}
+
+// A text that is no address becomes one that no connect() accepts.
+uint32_t addressOf(const String& text) {
+  return ipv4Address(text.view().substr(0, kMaxAddressText));
+}
+
+}  // namespace
+
+std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
+                                                                 const std::optional<Dictionary>& profile,
+                                                                 const std::optional<String>& productFamily) {
+  std::optional<String> serverIP;
+  uint16_t serverPort = 0;
+  if (profile) {
+    if (const String* ip = textOf(*profile, "ip")) serverIP = *ip;
+    serverPort = portOf(*profile);
+  }
+  return initWithName(platform, name, profile, serverIP, serverPort, productFamily);
+}
+
+std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
+                                                                 const std::optional<String>& serverIP,
+                                                                 uint16_t serverPort,
+                                                                 const std::optional<String>& productFamily) {
+  if (!serverIP) return nullptr;
+  return initWithName(platform, name, std::nullopt, serverIP, serverPort, productFamily);
+}
+
+std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
+                                                                 const std::optional<Dictionary>& profile,
+                                                                 const std::optional<String>& serverIP,
+                                                                 uint16_t serverPort,
+                                                                 const std::optional<String>& productFamily) {
+  struct Made final : DashboardBackend {
+    Made(Platform& p, const String& n, const std::optional<Dictionary>& d, const std::optional<String>& f,
+         std::unique_ptr<UDPSocket> s)
+        : DashboardBackend(p, n, d, f, std::move(s)) {}
+  };
+  if (profile && textOf(*profile, "ip") == nullptr) {
+    platform.log.error("DashboardBackend(initWithName): can't resolve server IP");
+    return nullptr;
+  }
+  if (profile && !has(*profile, "port")) {
+    platform.log.error("DashboardBackend(initWithName): can't resolve server port");
+    return nullptr;
+  }
+  auto opened = platform.udpSockets.open();
+  if (const int* number = std::get_if<int>(&opened)) {
+    platform.log.error("DashboardBackend(initWithName): socket() failed (%d)", *number);
+    return nullptr;
+  }
+  auto backend = std::make_shared<Made>(platform, name, profile, productFamily,
+                                        std::get<std::unique_ptr<UDPSocket>>(std::move(opened)));
+  // What was made so far ends with the object: the sources, the queue, the socket.
+  if (!backend->start(profile, serverIP, serverPort)) return nullptr;
+  return backend;
+}
+
+DashboardBackend::DashboardBackend(Platform& platform, String name, const std::optional<Dictionary>& profile,
+                                   std::optional<String> productFamily, std::unique_ptr<UDPSocket> socket)
+    : KYTReportingBackend(platform, std::move(name), profile.value_or(Dictionary()),
+                          std::move(productFamily)),
+      networkProcQueue_(SerialQueue::create("com.vantu.KYTReporting.networkProc", platform.executor)),
+      period_(kDefaultPeriod),
+      socket_(std::move(socket)) {}
+
+DashboardBackend::~DashboardBackend() = default;
+
+bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
+                             uint16_t serverPort) {
+  socket_->suppressBrokenPipeSignal();
+  uint32_t address = kNoIPv4Address;
+  uint16_t port = serverPort;
+  if (profile) {
+    address = addressOf(*textOf(*profile, "ip"));
+    port = portOf(*profile);
+    readProfile(*profile);
+  } else if (serverIP) {
+    address = addressOf(*serverIP);
+    useReliableUDP();
+  } else {
+    platform_.log.error("DashboardBackend(initWithName): initWitName with all null params.");
+    return false;
+  }
+  if (socket_->connect(address, port) != 0) {
+    platform_.log.error("DashboardBackend(initWithName): socket connect() failed.");
+    return false;
+  }
+  if (startTimer()) return true;
+  platform_.log.error("DashboardBackend(initWithName): can't create timer source.");
+  return false;
+}
+
+void DashboardBackend::readProfile(const Dictionary& profile) {
+  usingProfile_ = true;
+  if (const String* url = textOf(profile, "display_url")) displayURL_ = *url;
+  if (const String* url = textOf(profile, "post_url")) postURL_ = *url;
+  if (!has(profile, "reliable")) return;
+  useReliableUDP();
+  period_ = std::chrono::milliseconds(std::max(profile.find("reliable")->intValue(), kShortestPeriod));
+}
+
+bool DashboardBackend::startTimer() {
+  std::weak_ptr<KYTReportingBackend> weak = weak_from_this();
+  // More leeway than half a short period would lose ticks.
+  timer_ = platform_.timers.every(
+      period_, std::min(kLeeway, period_ / 2), networkProcQueue_, [weak = std::move(weak)] {
+        if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->myPeriodicTask();
+      });
+  return static_cast<bool>(timer_);
+}
+
+String DashboardBackend::descriptionForObject(const Value& object) {
+  if (const String* text = object.string()) return *text;
+  return object.isNumber() ? String(description(object)) : String("null");
+}
+
+String DashboardBackend::sanitize(const String& text) {
+  std::string out;
+  out.reserve(text.size());
+  for (const char c : text.view()) {
+    if (c == '\n') continue;
+    if (c == '\\' || c == '=') out += '\\';
+    out += c;
+  }
+  return out.empty() ? String("empty") : String(out);
+}
+
+DashboardDatagram::Header DashboardBackend::headerFor(const TimeValue& timestamp, uint16_t method,
+                                                      uint16_t respCode, EventID eventID) const {
+  DashboardDatagram::Header header;
+  header.selfVersionMajor = selfVersionMajor_;
+  header.clientType = static_cast<uint8_t>(compType_);
+  header.time = timestamp;
+  header.sessionID = sessionID_;
+  header.clientVersion = clientVersion_;
+  header.method = method;
+  header.respCode = respCode;
+  header.eventID = static_cast<uint16_t>(eventID);
+  header.flags = static_cast<uint16_t>((reliableUDP_ ? DashboardDatagram::kFlagReliable : 0) |
+                                       (usingProfile_ ? 0 : DashboardDatagram::kFlagWithoutProfile));
+  header.udid = udid_;
+  return header;
+}
+
+// Shortest values first, so that a long one costs no others when the text is cut.
+void DashboardBackend::appendPairs(const Dictionary& message, DashboardDatagram& datagram) {
+  struct Pair {
+    const String* key;
+    String text;
+    size_t length;
+  };
+  std::vector<Pair> pairs;
+  pairs.reserve(message.size());
+  for (const DictionaryEntry& entry : message) {
+    String text = descriptionForObject(entry.value);
+    const size_t length = text.utf16Length();
+    pairs.push_back({&entry.key, std::move(text), length});
+  }
+  std::stable_sort(pairs.begin(), pairs.end(),
+                   [](const Pair& a, const Pair& b) { return a.length < b.length; });
+  for (const Pair& pair : pairs) datagram.appendPair(pair.key->c_str(), sanitize(pair.text).c_str());
+}
+
+Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+                                    uint16_t respCode, EventID eventID) {
+  std::unique_ptr<DashboardDatagram> datagram(new (std::nothrow) DashboardDatagram);
+  if (datagram == nullptr) {
+    platform_.log.error("DashboardBackend(sendMessage): can't malloc.");
+    return {};
+  }
+  datagram->fill(headerFor(timestamp, method, respCode, eventID));
+  appendPairs(message, *datagram);
+  datagram->finish();
+
+  Value line = writeLocalLog(datagram->bytes());
+  networkProcQueue_->async([self = std::static_pointer_cast<DashboardBackend>(shared_from_this()),
+                            datagram = std::move(datagram),
+                            eventID] { self->tryToSendMsg(*datagram, eventID); });
+  return line;
+}
+
+String DashboardBackend::writeLocalLog(const std::byte* datagram) {
+  using Datagram = DashboardDatagram;
+  char device[Datagram::kDeviceSize + 1] = {};
+  std::copy_n(reinterpret_cast<const char*>(datagram + 20), Datagram::kDeviceSize, device);
+  char line[1152];
+  std::snprintf(
+      line, sizeof line, "%u.%03d %s 127.0.0.1 %s %5u %5u %5u %5u %5u %s", Datagram::number32(datagram + 4),
+      std::to_integer<int>(datagram[3]) * 4, device, clientTypeShortCode(std::to_integer<int>(datagram[1])),
+      static_cast<uint16_t>(~Datagram::number16(datagram + 12)), ~Datagram::number32(datagram + 8),
+      Datagram::number16(datagram + Datagram::kEventIDOffset), Datagram::number16(datagram + 16),
+      Datagram::number16(datagram + 18), reinterpret_cast<const char*>(datagram + Datagram::kHeaderSize));
+  return line;
+}
+
+}  // namespace kyt

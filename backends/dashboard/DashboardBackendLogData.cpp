@@ -1,0 +1,57 @@
+// The upload of a client's log data: one HTTP request, whose answer says where it can be found.
+#include "backends/dashboard/DashboardBackend.h"
+#include "platform/KeyedArchive.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/Semaphore.h"
+
+namespace kyt {
+
+bool DashboardBackend::uploadLogData(const Value& logData) {
+  if (!postURL_) {
+    platform_.log.error("DashboardBackend(uploadLogData): Post URL for log data array is nil");
+    return false;
+  }
+  std::optional<Data> body = archivedData(logData);
+  if (!body) {
+    platform_.log.error("DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
+    return false;
+  }
+  URLRequest request;
+  request.method = "POST";
+  request.url = postURL_->str();
+  request.headers = {{"Content-Type", "application/octet-stream"}};
+  request.body = std::move(*body);
+  const auto poster = connectivityDelegate();
+  // Deliberately a success: the session is ending, and its client is not told that something is wrong.
+  if (poster == nullptr) return true;
+
+  Semaphore answered;
+  std::optional<Data> reply;
+  std::optional<Error> error;
+  poster->postURLRequestWithCompletionHandler(
+      std::move(request),
+      [&](std::optional<Data> data, const std::optional<URLResponse>&, std::optional<Error> failure) {
+        reply = std::move(data);
+        error = std::move(failure);
+        answered.signal();
+      });
+  answered.wait();
+  return finishUpload(reply, error);
+}
+
+// The status is deliberately not looked at: any body is taken for the location.
+bool DashboardBackend::finishUpload(const std::optional<Data>& reply, const std::optional<Error>& error) {
+  if (error || !reply) {
+    platform_.log.error("DashboardBackend(uploadLogData): Error uploading log data array (%s)",
+                        error ? error->localizedDescription.c_str() : "(null)");
+    return false;
+  }
+  const String location(reply->view());
+  platform_.log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s", location.c_str());
+  // Numbered like every event, but not sent: it ends in the base's operation that does nothing.
+  sendMessage({{"LogDataUploadLocation", location}}, platform_.clock.timeOfDay(), 0, 2, MessageFlag{0});
+  return true;
+}
+
+}  // namespace kyt
