@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "config/ClientTypes.h"
-#include "platform/IPv4Address.h"
+#include "platform/InternetAddress.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
 

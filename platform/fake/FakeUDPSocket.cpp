@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
-#include "platform/IPv4Address.h"
+#include "platform/InternetAddress.h"
 
 namespace kyt {
 

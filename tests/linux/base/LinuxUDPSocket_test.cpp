@@ -12,7 +12,7 @@
 #include <cerrno>
 #include <string>
 
-#include "platform/IPv4Address.h"
+#include "platform/InternetAddress.h"
 #include "platform/Semaphore.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "tests/support/Eventually.h"

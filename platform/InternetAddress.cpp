@@ -1,4 +1,4 @@
-#include "platform/IPv4Address.h"
+#include "platform/InternetAddress.h"
 
 #include <optional>
 
