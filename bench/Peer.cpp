@@ -90,22 +90,35 @@ bool Peer::awaitReply(uint32_t serial) {
   }
 }
 
-bool Peer::ping() {
-  std::string out;
+bool Peer::call(std::string_view interface, std::string_view member, std::string out) {
   MessageWriter writer(out);
   MessageWriter::Call call;
-  call.interface = wire::kPeerInterface;
-  call.member = "Ping";
+  call.interface = interface;
+  call.member = member;
   writer.beginCall(77777, call);
   return writer.end() && send(out) && awaitReply(77777);
 }
 
-ProcessFigures figuresOf(int pid) {
-  ProcessFigures figures;
+bool Peer::ping() {
+  return call(wire::kPeerInterface, "Ping");
+}
+bool Peer::sendAndPing(std::string bytes) {
+  return call(wire::kPeerInterface, "Ping", std::move(bytes));
+}
+bool Peer::flush() {
+  return call(wire::kSessionInterface, "FlushMessagesWithCompletion");
+}
+
+double processorSeconds(int pid) {
   clockid_t clock{};
   timespec spent{};
-  if (clock_getcpuclockid(pid, &clock) == 0 && clock_gettime(clock, &spent) == 0)
-    figures.processorSeconds = static_cast<double>(spent.tv_sec) + static_cast<double>(spent.tv_nsec) / 1e9;
+  if (clock_getcpuclockid(pid, &clock) != 0 || clock_gettime(clock, &spent) != 0) return 0;
+  return static_cast<double>(spent.tv_sec) + static_cast<double>(spent.tv_nsec) / 1e9;
+}
+
+ProcessFigures figuresOf(int pid) {
+  ProcessFigures figures;
+  figures.processorSeconds = processorSeconds(pid);
   const std::string process = "/proc/" + std::to_string(pid);
   std::ifstream status(process + "/status");
   for (std::string key; status >> key;) {

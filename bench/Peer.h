@@ -21,8 +21,13 @@ class Peer {
   [[nodiscard]] bool send(std::string_view bytes);
   // A call of Peer.Ping and its reply: everything sent before has been handled. Blocks.
   [[nodiscard]] bool ping();
+  // Both in one write, as a client's queue leaves.
+  [[nodiscard]] bool sendAndPing(std::string bytes);
+  // A call of FlushMessagesWithCompletion and its reply. Blocks.
+  [[nodiscard]] bool flush();
 
  private:
+  [[nodiscard]] bool call(std::string_view interface, std::string_view member, std::string before = {});
   [[nodiscard]] bool awaitReply(uint32_t serial);
   int fd_ = -1;
   std::string in_;
@@ -35,5 +40,6 @@ struct ProcessFigures {
   uint64_t switches = 0;  // voluntary context switches of all its threads
 };
 [[nodiscard]] ProcessFigures figuresOf(int pid);
+[[nodiscard]] double processorSeconds(int pid);
 
 }  // namespace kyt::bench
