@@ -2,11 +2,10 @@
 
 #include <sys/stat.h>
 #include <sys/uio.h>
-#define SD_JOURNAL_SUPPRESS_LOCATION  // the place in this file is the same for every line
-#include <systemd/sd-journal.h>
 
 #include "platform/TextEscape.h"
 #include "platform/linux/system/Files.h"
+#include "platform/linux/system/SystemdLibrary.h"
 
 namespace kyt {
 namespace {
@@ -47,6 +46,17 @@ bool JournalSink::isAvailable() {
   return ::stat("/run/systemd/journal/socket", &status) == 0 && S_ISSOCK(status.st_mode);
 }
 
+std::unique_ptr<JournalSink> JournalSink::open(std::string identifier) {
+  const auto loaded = SystemdLibrary::load();
+  if (const auto* problem = std::get_if<std::string>(&loaded)) {
+    StderrSink().write(LogLevel::error, "JournalSink(open): no journal: " + *problem);
+    return nullptr;
+  }
+  // The function that takes no place in the source: it would be the same for every line.
+  Send* const send = std::get<SystemdLibrary>(loaded).journalSend;
+  return std::unique_ptr<JournalSink>(new JournalSink(send, std::move(identifier)));
+}
+
 void JournalSink::write(LogLevel level, std::string_view line) {
   std::string message = "MESSAGE=";
   appendEscaped(message, line);
@@ -56,13 +66,13 @@ void JournalSink::write(LogLevel level, std::string_view line) {
   const size_t colon = line.substr(0, kLongestOperation).find(':');
   if (colon != std::string_view::npos) appendEscaped(operation, line.substr(0, colon));
   const iovec fields[] = {field(message), field(priorityField), field(identifier), field(operation)};
-  if (::sd_journal_sendv(fields, 4) < 0) fallback_.write(level, line);
+  if (send_(fields, 4) < 0) fallback_.write(level, line);
 }
 
 std::unique_ptr<LogSink> makeLogSink(LogTarget target) {
   // Without its socket libsystemd would report success and drop every line.
   if (target != LogTarget::standardError && JournalSink::isAvailable()) {
-    return std::make_unique<JournalSink>();
+    if (auto journal = JournalSink::open()) return journal;
   }
   return std::make_unique<StderrSink>();
 }

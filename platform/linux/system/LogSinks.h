@@ -10,6 +10,8 @@
 #include "platform/Log.h"
 #include "platform/Settings.h"
 
+struct iovec;
+
 namespace kyt {
 
 // A line each, in one write: "<7>" in front for debug, "<6>" for default, "<3>" for error.
@@ -26,12 +28,16 @@ class StderrSink final : public LogSink {
 // colon). What the journal does not take goes to standard error.
 class JournalSink final : public LogSink {
  public:
-  explicit JournalSink(std::string identifier = "kytreportingd") : identifier_(std::move(identifier)) {}
+  // None where libsystemd is missing; why is written to standard error.
+  [[nodiscard]] static std::unique_ptr<JournalSink> open(std::string identifier = "kytreportingd");
   void write(LogLevel level, std::string_view line) override;
   // Whether the journal's socket is there.
   [[nodiscard]] static bool isAvailable();
 
  private:
+  using Send = int(const iovec*, int);
+  JournalSink(Send* send, std::string identifier) : send_(send), identifier_(std::move(identifier)) {}
+  Send* const send_;  // sd_journal_sendv
   const std::string identifier_;
   StderrSink fallback_;
 };

@@ -4,14 +4,16 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
-#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <utility>
 
 #include "platform/SerialQueue.h"
 #include "platform/TextEscape.h"
+#include "platform/linux/system/LogSinks.h"
+#include "platform/linux/system/SystemdLibrary.h"
 
 namespace kyt {
 namespace {
@@ -21,16 +23,30 @@ constexpr int kBestEffortClass = 2;  // IOPRIO_CLASS_BE
 constexpr int kUtilityPriority = 6;  // of 0 (first) to 7
 constexpr int kOfThread = 1;         // IOPRIO_WHO_PROCESS; 0 is the calling thread
 
+void tell(const std::string& state) {
+  if (std::getenv("NOTIFY_SOCKET") == nullptr) return;
+  const auto loaded = SystemdLibrary::load();
+  if (const auto* problem = std::get_if<std::string>(&loaded)) {
+    StderrSink().write(LogLevel::error, "ServiceManager(tell): cannot tell the service manager: " + *problem);
+    return;
+  }
+  (void)std::get<SystemdLibrary>(loaded).notify(0, state.c_str());
+}
+
 }  // namespace
 
 std::variant<FileHandle, std::string> ServiceManager::takeListeningSocket() {
-  const int count = ::sd_listen_fds(1);
+  if (std::getenv("LISTEN_FDS") == nullptr) return FileHandle();
+  const auto loaded = SystemdLibrary::load();
+  if (const auto* problem = std::get_if<std::string>(&loaded)) return "LISTEN_FDS: " + *problem;
+  const auto& systemd = std::get<SystemdLibrary>(loaded);
+  const int count = systemd.listenDescriptors(1);
   if (count < 0) return "LISTEN_FDS: " + errorText(-count);
   if (count == 0) return FileHandle();
   FileHandle socket(SD_LISTEN_FDS_START);
   for (int extra = 1; extra < count; ++extra) ::close(SD_LISTEN_FDS_START + extra);
   if (count > 1) return std::string("LISTEN_FDS: more than one socket was handed over");
-  if (::sd_is_socket(socket.get(), AF_UNIX, SOCK_STREAM, 1) <= 0) {
+  if (systemd.isSocket(socket.get(), AF_UNIX, SOCK_STREAM, 1) <= 0) {
     return std::string("LISTEN_FDS: what was handed over is no listening Unix stream socket");
   }
   const int flags = ::fcntl(socket.get(), F_GETFL);
@@ -40,15 +56,15 @@ std::variant<FileHandle, std::string> ServiceManager::takeListeningSocket() {
 }
 
 void ServiceManager::ready(const std::string& status) {
-  (void)::sd_notify(0, ("READY=1\nSTATUS=" + escapedText(status)).c_str());
+  tell("READY=1\nSTATUS=" + escapedText(status));
 }
 
 void ServiceManager::stopping() {
-  (void)::sd_notify(0, "STOPPING=1\nSTATUS=Stopping");
+  tell("STOPPING=1\nSTATUS=Stopping");
 }
 
 void ServiceManager::status(const std::string& status) {
-  (void)::sd_notify(0, ("STATUS=" + escapedText(status)).c_str());
+  tell("STATUS=" + escapedText(status));
 }
 
 bool enterUtilityServiceClass() {

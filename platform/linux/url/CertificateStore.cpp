@@ -1,6 +1,5 @@
 #include "platform/linux/url/CertificateStore.h"
 
-#include <openssl/ssl.h>
 #include <openssl/x509_vfy.h>
 
 namespace kyt {
@@ -37,10 +36,8 @@ bool CertificateStore::load() {
   return true;
 }
 
-bool CertificateStore::install(ssl_ctx_st* context) {
-  if (!load()) return false;
-  SSL_CTX_set1_cert_store(context, store_);
-  return true;
+x509_store_st* CertificateStore::store() {
+  return load() ? store_ : nullptr;
 }
 
 }  // namespace kyt

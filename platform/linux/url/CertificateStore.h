@@ -8,7 +8,6 @@
 
 #include <string>
 
-struct ssl_ctx_st;
 struct x509_store_st;
 
 namespace kyt {
@@ -21,8 +20,8 @@ class CertificateStore {
   CertificateStore(const CertificateStore&) = delete;
   CertificateStore& operator=(const CertificateStore&) = delete;
 
-  // Makes a connection's TLS settings use this store; false when there is no readable certificate.
-  [[nodiscard]] bool install(ssl_ctx_st* context);
+  // For a connection's TLS settings, which take a reference; null when there is no readable certificate.
+  [[nodiscard]] x509_store_st* store();
 
  private:
   [[nodiscard]] bool load();

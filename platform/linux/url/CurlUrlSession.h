@@ -31,6 +31,7 @@ class Log;
 class URLNetwork;
 
 struct CurlURLSessionOptions {
+  std::string library = "libcurl.so.4";                     // loaded at the first request
   std::string certificateFile;                              // PEM; empty: the system's
   std::vector<std::string> cellularInterfaces = {"wwan*"};  // shell patterns, besides what the kernel marks
   Duration noProgressTimeout = std::chrono::seconds(60);

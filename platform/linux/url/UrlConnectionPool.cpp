@@ -1,6 +1,5 @@
 #include "platform/linux/url/UrlConnectionPool.h"
 
-#include <openssl/ssl.h>
 #include <sys/epoll.h>
 
 #include "platform/Limits.h"
@@ -13,9 +12,12 @@ namespace {
 constexpr long kConnectionsPerServer = 8;
 constexpr size_t kKeptHandles = 2;  // each keeps its buffers
 
-CURLcode useCertificates(CURL*, void* context, void* network) {
-  CertificateStore& store = static_cast<URLNetwork*>(network)->certificates();
-  return store.install(static_cast<SSL_CTX*>(context)) ? CURLE_OK : CURLE_SSL_CACERT_BADFILE;
+CURLcode useCertificates(CURL*, void* context, void* connectionsOf) {
+  auto& network = *static_cast<URLNetwork*>(connectionsOf);
+  x509_store_st* store = network.certificates().store();
+  if (store == nullptr) return CURLE_SSL_CACERT_BADFILE;
+  network.curl().setCertificateStore(static_cast<ssl_ctx_st*>(context), store);
+  return CURLE_OK;
 }
 
 }  // namespace
@@ -24,7 +26,8 @@ URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& sessi
     : network_(network),
       session_(session),
       number_(number),
-      multi_(curl_multi_init()),
+      curl_(network.curl()),
+      multi_(curl_.multiInit()),
       timer_(
           network.deadlines(), [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); },
           this),
@@ -37,18 +40,18 @@ URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& sessi
           },
           this) {
   if (multi_ == nullptr) return;
-  curl_multi_setopt(multi_, CURLMOPT_SOCKETFUNCTION, socketChanged);
-  curl_multi_setopt(multi_, CURLMOPT_SOCKETDATA, this);
-  curl_multi_setopt(multi_, CURLMOPT_TIMERFUNCTION, timerChanged);
-  curl_multi_setopt(multi_, CURLMOPT_TIMERDATA, this);
-  curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
-  curl_multi_setopt(multi_, CURLMOPT_MAXCONNECTS, kConnectionsPerServer);
+  curl_.multiSetOption(multi_, CURLMOPT_SOCKETFUNCTION, socketChanged);
+  curl_.multiSetOption(multi_, CURLMOPT_SOCKETDATA, this);
+  curl_.multiSetOption(multi_, CURLMOPT_TIMERFUNCTION, timerChanged);
+  curl_.multiSetOption(multi_, CURLMOPT_TIMERDATA, this);
+  curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
+  curl_.multiSetOption(multi_, CURLMOPT_MAXCONNECTS, kConnectionsPerServer);
 }
 
 URLConnectionPool::~URLConnectionPool() {
   leaveIdle();
-  for (CURL* handle : idleHandles_) curl_easy_cleanup(handle);
-  if (multi_ != nullptr) curl_multi_cleanup(multi_);
+  for (CURL* handle : idleHandles_) curl_.easyCleanup(handle);
+  if (multi_ != nullptr) curl_.multiCleanup(multi_);
 }
 
 CURL* URLConnectionPool::takeHandle() {
@@ -57,7 +60,7 @@ CURL* URLConnectionPool::takeHandle() {
     idleHandles_.pop_back();
     return handle;
   }
-  CURL* handle = curl_easy_init();
+  CURL* handle = curl_.easyInit();
   if (handle == nullptr) return nullptr;
   const auto milliseconds = [](Duration duration) {
     return static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(duration).count());
@@ -66,31 +69,32 @@ CURL* URLConnectionPool::takeHandle() {
     return static_cast<long>(std::chrono::ceil<std::chrono::seconds>(duration).count());
   };
   const CurlURLSessionOptions& options = network_.options();
-  curl_easy_setopt(handle, CURLOPT_NOSIGNAL, 1L);
-  curl_easy_setopt(handle, CURLOPT_NOPROGRESS, 0L);
-  curl_easy_setopt(handle, CURLOPT_PROTOCOLS_STR, "http,https");
-  curl_easy_setopt(handle, CURLOPT_REDIR_PROTOCOLS_STR, "https");
-  curl_easy_setopt(handle, CURLOPT_PROXY, "");  // nor one from the environment
-  curl_easy_setopt(handle, CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
-  curl_easy_setopt(handle, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
-  curl_easy_setopt(handle, CURLOPT_PIPEWAIT, 1L);  // a burst shares one HTTP/2 connection
-  curl_easy_setopt(handle, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
-  curl_easy_setopt(handle, CURLOPT_SSL_VERIFYPEER, 1L);
-  curl_easy_setopt(handle, CURLOPT_SSL_VERIFYHOST, 2L);
-  curl_easy_setopt(handle, CURLOPT_CAINFO, nullptr);  // the store below instead
-  curl_easy_setopt(handle, CURLOPT_CAPATH, nullptr);
-  curl_easy_setopt(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
-  curl_easy_setopt(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
-  curl_easy_setopt(handle, CURLOPT_SSL_CTX_DATA, &network_);
-  curl_easy_setopt(handle, CURLOPT_BUFFERSIZE, 4096L);  // replies are small, sessions many
-  curl_easy_setopt(handle, CURLOPT_TCP_NODELAY, 1L);
-  curl_easy_setopt(handle, CURLOPT_CONNECTTIMEOUT_MS,
-                   std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
-  curl_easy_setopt(handle, CURLOPT_MAXAGE_CONN, seconds(options.idleConnectionTime));
-  curl_easy_setopt(handle, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(Limits::maxHTTPReplyBytes));
-  curl_easy_setopt(handle, CURLOPT_CLOSESOCKETFUNCTION, URLNetwork::socketClosed);
-  curl_easy_setopt(handle, CURLOPT_CLOSESOCKETDATA, &network_);
-  curl_easy_setopt(handle, CURLOPT_QUICK_EXIT, 1L);  // giving up a look-up of a name must not wait for it
+  curl_.easySetOption(handle, CURLOPT_NOSIGNAL, 1L);
+  curl_.easySetOption(handle, CURLOPT_NOPROGRESS, 0L);
+  curl_.easySetOption(handle, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl_.easySetOption(handle, CURLOPT_REDIR_PROTOCOLS_STR, "https");
+  curl_.easySetOption(handle, CURLOPT_PROXY, "");  // nor one from the environment
+  curl_.easySetOption(handle, CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
+  curl_.easySetOption(handle, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+  curl_.easySetOption(handle, CURLOPT_PIPEWAIT, 1L);  // a burst shares one HTTP/2 connection
+  curl_.easySetOption(handle, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
+  curl_.easySetOption(handle, CURLOPT_SSL_VERIFYPEER, 1L);
+  curl_.easySetOption(handle, CURLOPT_SSL_VERIFYHOST, 2L);
+  curl_.easySetOption(handle, CURLOPT_CAINFO, nullptr);  // the store below instead
+  curl_.easySetOption(handle, CURLOPT_CAPATH, nullptr);
+  curl_.easySetOption(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
+  curl_.easySetOption(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
+  curl_.easySetOption(handle, CURLOPT_SSL_CTX_DATA, &network_);
+  curl_.easySetOption(handle, CURLOPT_BUFFERSIZE, 4096L);  // replies are small, sessions many
+  curl_.easySetOption(handle, CURLOPT_TCP_NODELAY, 1L);
+  curl_.easySetOption(
+      handle, CURLOPT_CONNECTTIMEOUT_MS,
+      std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
+  curl_.easySetOption(handle, CURLOPT_MAXAGE_CONN, seconds(options.idleConnectionTime));
+  curl_.easySetOption(handle, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(Limits::maxHTTPReplyBytes));
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETFUNCTION, URLNetwork::socketClosed);
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETDATA, &network_);
+  curl_.easySetOption(handle, CURLOPT_QUICK_EXIT, 1L);  // giving up a look-up of a name must not wait for it
   return handle;
 }
 
@@ -98,8 +102,8 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
   if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
   transfer.configure(handle);
-  if (curl_multi_add_handle(multi_, handle) != CURLM_OK) {
-    curl_easy_cleanup(handle);
+  if (curl_.multiAdd(multi_, handle) != CURLM_OK) {
+    curl_.easyCleanup(handle);
     return CURLE_FAILED_INIT;
   }
   transfer.handle = handle;
@@ -110,13 +114,13 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
 
 void URLConnectionPool::remove(URLTransfer& transfer) {
   CURL* handle = std::exchange(transfer.handle, nullptr);
-  curl_multi_remove_handle(multi_, handle);
+  curl_.multiRemove(multi_, handle);
   if (idleHandles_.size() < kKeptHandles) {
-    curl_easy_setopt(handle, CURLOPT_ERRORBUFFER, nullptr);
-    curl_easy_setopt(handle, CURLOPT_HTTPHEADER, nullptr);
+    curl_.easySetOption(handle, CURLOPT_ERRORBUFFER, nullptr);
+    curl_.easySetOption(handle, CURLOPT_HTTPHEADER, nullptr);
     idleHandles_.push_back(handle);
   } else {
-    curl_easy_cleanup(handle);
+    curl_.easyCleanup(handle);
   }
   --active_;
   closeIfIdle();
@@ -153,7 +157,7 @@ int URLConnectionPool::timerChanged(CURLM*, long milliseconds, void* pool) {
 
 void URLConnectionPool::timerExpired() {
   int running = 0;
-  curl_multi_socket_action(multi_, CURL_SOCKET_TIMEOUT, 0, &running);
+  curl_.multiSocketAction(multi_, CURL_SOCKET_TIMEOUT, 0, &running);
   finishEnded();
 }
 
@@ -162,17 +166,17 @@ void URLConnectionPool::socketReady(int socket, uint32_t events) {
   if ((events & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
   if ((events & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
   if ((events & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
-  curl_multi_socket_action(multi_, socket, mask, &running);
+  curl_.multiSocketAction(multi_, socket, mask, &running);
   finishEnded();
 }
 
 void URLConnectionPool::finishEnded() {
   int left = 0;
-  while (const CURLMsg* message = curl_multi_info_read(multi_, &left)) {
+  while (const CURLMsg* message = curl_.multiReadInfo(multi_, &left)) {
     if (message->msg != CURLMSG_DONE) continue;
     URLTransfer* transfer = nullptr;
     const CURLcode code = message->data.result;
-    curl_easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &transfer);
+    curl_.easyGetInfo(message->easy_handle, CURLINFO_PRIVATE, &transfer);
     network_.transferEnded(*transfer, code);
   }
 }

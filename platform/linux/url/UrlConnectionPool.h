@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <vector>
 
+#include "platform/linux/url/CurlLibrary.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/LinkedList.h"
 
@@ -44,6 +45,7 @@ class URLConnectionPool {
   URLNetwork& network_;
   URLSessionState& session_;
   const size_t number_;  // in the session
+  const CurlLibrary& curl_;
   CURLM* multi_;
   size_t active_ = 0;
   std::vector<CURL*> idleHandles_;

@@ -146,7 +146,6 @@ URLFigures URLNetwork::figures() const {
 
 void URLNetwork::run() {
   nameThread("kyt-network");
-  curl_global_init(CURL_GLOBAL_DEFAULT);
   workers_ = std::make_unique<WorkerPool>(completionWorkers());
   epoll_event wake{};
   wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read
@@ -172,7 +171,7 @@ void URLNetwork::run() {
     closePool(*session, 0);
     closePool(*session, 1);
   }
-  curl_global_cleanup();
+  if (curl_) curl_->globalCleanup();
 }
 
 void URLNetwork::handleEvent(uint64_t which, uint32_t events) {
@@ -223,9 +222,23 @@ void URLNetwork::begin(std::shared_ptr<URLTransfer> transfer) {
     fail(begun, kURLErrorCancelled, "The URL session was invalidated");
   } else if (!namesItsScheme(begun.request.url)) {
     fail(begun, CURLE_UNSUPPORTED_PROTOCOL, "The address begins neither with https:// nor with http://");
+  } else if (!curl_ && !loadCurl()) {
+    fail(begun, CURLE_FAILED_INIT, "The HTTP library cannot be loaded");
   } else {
     activate(begun);
   }
+}
+
+// Tried anew by each request: a library that is being replaced is missing for a moment only.
+bool URLNetwork::loadCurl() {
+  auto loaded = CurlLibrary::load(options_.library.c_str());
+  if (const auto* problem = std::get_if<std::string>(&loaded)) {
+    if (std::exchange(curlProblem_, *problem) != *problem)
+      log_.error("CurlURLSession(start): cannot load the HTTP library: %s", problem->c_str());
+    return false;
+  }
+  curl_ = std::get<CurlLibrary>(loaded);
+  return true;
 }
 
 void URLNetwork::activate(URLTransfer& transfer) {
@@ -238,7 +251,7 @@ void URLNetwork::activate(URLTransfer& transfer) {
   const CURLcode code = pool->add(transfer);
   if (code != CURLE_OK) {
     pool->closeIfIdle();
-    fail(transfer, code, curl_easy_strerror(code));
+    fail(transfer, code, curl_->easyErrorText(code));
     return;
   }
   transfer.phase = URLTransfer::Phase::active;
@@ -269,8 +282,8 @@ void URLNetwork::transferDeadline(URLTransfer& transfer) {
 
 void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
   long status = 0, systemError = 0;
-  curl_easy_getinfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
-  curl_easy_getinfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
+  curl_->easyGetInfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
+  curl_->easyGetInfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
   if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
   withdraw(transfer);
   if (code == CURLE_OK) {
@@ -283,7 +296,7 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
   if (transfer.onlyCellularRoutes) {
     fail(transfer, code, "The request may not use cellular interfaces, and no other leads to the server");
   } else {
-    fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_easy_strerror(code));
+    fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_->easyErrorText(code));
   }
 }
 

@@ -18,6 +18,7 @@
 #include "platform/Mutex.h"
 #include "platform/WorkerPool.h"
 #include "platform/linux/url/CertificateStore.h"
+#include "platform/linux/url/CurlLibrary.h"
 #include "platform/linux/url/CurlUrlSession.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/RouteEvents.h"
@@ -74,6 +75,7 @@ class URLNetwork {
   [[nodiscard]] DeadlineHeap& deadlines() { return deadlines_; }
   [[nodiscard]] IdlePools& idlePools() { return idlePools_; }
   [[nodiscard]] RouteTable& routes() { return routes_; }
+  [[nodiscard]] const CurlLibrary& curl() const { return *curl_; }  // loaded, once there is a pool
   [[nodiscard]] CertificateStore& certificates() { return certificates_; }
   [[nodiscard]] const CurlURLSessionOptions& options() const { return options_; }
   [[nodiscard]] WatchedSockets& sockets() { return sockets_; }
@@ -96,6 +98,7 @@ class URLNetwork {
   void handleEvent(uint64_t which, uint32_t events);
   void takeCommands();
   void begin(std::shared_ptr<URLTransfer> transfer);
+  [[nodiscard]] bool loadCurl();
   void activate(URLTransfer& transfer);
   void armDeadline(URLTransfer& transfer);
   void withdraw(URLTransfer& transfer);  // from its pool, or from those that wait
@@ -142,6 +145,8 @@ class URLNetwork {
   RouteTable routes_;
   RouteEvents routeEvents_;
   CertificateStore certificates_;
+  std::optional<CurlLibrary> curl_;
+  std::string curlProblem_;  // the last one that was logged
   WatchedSockets sockets_;
   std::vector<Command> taken_;
   LinkedList<URLSessionState> sessions_;  // that have requests or connections

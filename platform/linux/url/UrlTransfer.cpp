@@ -86,32 +86,33 @@ void URLTransfer::clearReply() {
 }
 
 void URLTransfer::configure(CURL* easy) {
+  const CurlLibrary& curl = session->network->curl();
   if (headerList_.empty()) buildHeaders();
-  curl_easy_setopt(easy, CURLOPT_PRIVATE, this);
-  curl_easy_setopt(easy, CURLOPT_URL, request.url.c_str());
-  curl_easy_setopt(easy, CURLOPT_HTTPHEADER, headerList_.data());
-  curl_easy_setopt(easy, CURLOPT_ERRORBUFFER, errorText);
-  curl_easy_setopt(easy, CURLOPT_HEADERFUNCTION, receiveHeader);
-  curl_easy_setopt(easy, CURLOPT_HEADERDATA, this);
-  curl_easy_setopt(easy, CURLOPT_WRITEFUNCTION, receiveBody);
-  curl_easy_setopt(easy, CURLOPT_WRITEDATA, this);
-  curl_easy_setopt(easy, CURLOPT_XFERINFOFUNCTION, noteProgress);
-  curl_easy_setopt(easy, CURLOPT_XFERINFODATA, this);
-  curl_easy_setopt(easy, CURLOPT_OPENSOCKETFUNCTION, openSocket);
-  curl_easy_setopt(easy, CURLOPT_OPENSOCKETDATA, this);
-  curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, request.maxRedirects > 0 ? 1L : 0L);
-  curl_easy_setopt(easy, CURLOPT_MAXREDIRS, static_cast<long>(request.maxRedirects));
+  curl.easySetOption(easy, CURLOPT_PRIVATE, this);
+  curl.easySetOption(easy, CURLOPT_URL, request.url.c_str());
+  curl.easySetOption(easy, CURLOPT_HTTPHEADER, headerList_.data());
+  curl.easySetOption(easy, CURLOPT_ERRORBUFFER, errorText);
+  curl.easySetOption(easy, CURLOPT_HEADERFUNCTION, receiveHeader);
+  curl.easySetOption(easy, CURLOPT_HEADERDATA, this);
+  curl.easySetOption(easy, CURLOPT_WRITEFUNCTION, receiveBody);
+  curl.easySetOption(easy, CURLOPT_WRITEDATA, this);
+  curl.easySetOption(easy, CURLOPT_XFERINFOFUNCTION, noteProgress);
+  curl.easySetOption(easy, CURLOPT_XFERINFODATA, this);
+  curl.easySetOption(easy, CURLOPT_OPENSOCKETFUNCTION, openSocket);
+  curl.easySetOption(easy, CURLOPT_OPENSOCKETDATA, this);
+  curl.easySetOption(easy, CURLOPT_FOLLOWLOCATION, request.maxRedirects > 0 ? 1L : 0L);
+  curl.easySetOption(easy, CURLOPT_MAXREDIRS, static_cast<long>(request.maxRedirects));
 
-  curl_easy_setopt(easy, CURLOPT_HTTPGET, 1L);
-  curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, nullptr);
+  curl.easySetOption(easy, CURLOPT_HTTPGET, 1L);
+  curl.easySetOption(easy, CURLOPT_CUSTOMREQUEST, nullptr);
   if (request.method == "HEAD") {
-    curl_easy_setopt(easy, CURLOPT_NOBODY, 1L);
+    curl.easySetOption(easy, CURLOPT_NOBODY, 1L);
   } else if (request.method != "GET" || !request.body.empty()) {
     const std::string_view body = request.body.view();
-    curl_easy_setopt(easy, CURLOPT_POST, 1L);
-    curl_easy_setopt(easy, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
-    curl_easy_setopt(easy, CURLOPT_POSTFIELDS, body.empty() ? "" : body.data());
-    if (request.method != "POST") curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, request.method.c_str());
+    curl.easySetOption(easy, CURLOPT_POST, 1L);
+    curl.easySetOption(easy, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+    curl.easySetOption(easy, CURLOPT_POSTFIELDS, body.empty() ? "" : body.data());
+    if (request.method != "POST") curl.easySetOption(easy, CURLOPT_CUSTOMREQUEST, request.method.c_str());
   }
 }
 
