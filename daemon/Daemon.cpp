@@ -8,6 +8,7 @@
 #include "platform/Keys.h"
 #include "platform/Paths.h"
 #include "platform/Settings.h"
+#include "platform/linux/base/CodePages.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/StopSignals.h"
 #include "platform/linux/base/UnixSocket.h"
@@ -85,6 +86,7 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
+  static_cast<void>(giveBackCodePages());
   const int signal = stopSignals.wait();
   ServiceManager::stopping();
   if (signal != 0)

@@ -11,6 +11,8 @@
 #include <csignal>
 #include <system_error>
 
+#include "platform/linux/base/CodePages.h"
+
 namespace kyt {
 namespace {
 
@@ -238,6 +240,7 @@ bool URLNetwork::loadCurl() {
     return false;
   }
   curl_ = std::get<CurlLibrary>(loaded);
+  static_cast<void>(giveBackCodePages());
   return true;
 }
 

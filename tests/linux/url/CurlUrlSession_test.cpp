@@ -40,6 +40,20 @@ TEST_F(CurlURLSession, DeliversStatusHeadersAndBody) {
   EXPECT_EQ(figures.failed, 0u);
 }
 
+TEST_F(CurlURLSession, WithoutItsLibraryEveryRequestFailsAndTheLogSaysWhyOnce) {
+  options_.library = "libkytnosuch.so.4";
+  auto urls = session();
+  for (int i = 0; i < 2; ++i) {
+    const Outcome outcome = perform(*urls, get(server_.url("/")));
+    EXPECT_EQ(outcome.errorCode(), CURLE_FAILED_INIT);
+    EXPECT_EQ(outcome.errorText(), "The HTTP library cannot be loaded");
+  }
+  EXPECT_EQ(factory().figures().failed, 2u);
+  EXPECT_EQ(server_.requests().size(), 0u);
+  factory_.reset();
+  EXPECT_EQ(sink_.count("libkytnosuch.so.4"), 1u);
+}
+
 TEST_F(CurlURLSession, SendsTheHeadersGivenInTheirOrderAndNoOthersOfItsOwn) {
   auto urls = session();
   URLRequest request = post(server_.url("/events"), "{\"a\":1}");
