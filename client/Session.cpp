@@ -95,6 +95,7 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
   }
   Item item;
   item.command = std::move(command);
+  // NOLINTBEGIN(bugprone-use-after-move): push() leaves what it refuses.
   if (overflowed_.load() > 0 || !ring_.push(std::move(item))) {
     MutexLock lock(overflowMutex_);
     if (overflow_.size() < kMaxOverflow) {
@@ -103,6 +104,7 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
     }
   }
   if (item.command) item.command->fail(ClientError::queueFull, "the queue is full");
+  // NOLINTEND(bugprone-use-after-move)
   noticeWork();
 }
 

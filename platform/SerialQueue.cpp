@@ -115,6 +115,7 @@ void SerialQueue::async(Task task) {
       if (!self) self = shared_from_this();  // before others can run the work and drop the queue
     }
   } while (!state_.compare_exchange_weak(state, next, std::memory_order_acq_rel, std::memory_order_relaxed));
+  // The list owns the node from here on.  NOLINTNEXTLINE(clang-analyzer-cplusplus.NewDeleteLeaks)
   if ((state & kFlags) == 0) schedule(std::move(self), true);
 }
 

@@ -272,7 +272,7 @@ void Dictionary::merge(const Dictionary& other) {
     *this = other;
     return;
   }
-  const Dictionary source(other);  // other may be this very object
+  const Dictionary source(other);  // NOLINT(performance-*): other may be this very object
   for (const DictionaryEntry& entry : source) set(entry.key, entry.value);
 }
 

@@ -100,7 +100,7 @@ void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
     }
   }
   if (toWake != nullptr) toWake->wake.notifyOne();
-  if (queue) queue->discardPending();
+  if (queue) queue->discardPending();  // NOLINT(bugprone-use-after-move): null when it was moved
 }
 
 // Counts a sleeping worker as looking and returns it, or starts one, if work waits that no worker would see

@@ -14,7 +14,7 @@ extern char** environ;
 namespace kyt::tools {
 
 ChildProcess::ChildProcess(ChildProcess&& other) noexcept
-    : pid_(std::exchange(other.pid_, -1)), status_(std::move(other.status_)) {}
+    : pid_(std::exchange(other.pid_, -1)), status_(other.status_) {}
 
 ChildProcess& ChildProcess::operator=(ChildProcess&& other) noexcept {
   std::swap(pid_, other.pid_);
