@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -24,8 +25,9 @@ struct Options {
   std::vector<std::string> hosts;  // names and addresses beyond those of loopback, for the certificate
   uint16_t httpsPort = 8443;
   uint16_t httpPort = 8080;
-  bool httpEvents = false;  // take event posts on the plain port too
-  unsigned maxAge = 3600;   // seconds, of a storebag's Cache-Control
+  std::optional<uint16_t> udpPort;  // of the dashboard feed; none: it is not taken
+  bool httpEvents = false;          // take event posts and log data on the plain port too
+  unsigned maxAge = 3600;           // seconds, of a storebag's Cache-Control
   std::vector<DigestKey> digestKeys;
   uint64_t maxBodyBytes = 16 << 20;      // of a post as sent
   uint64_t maxInflatedBytes = 64 << 20;  // of its JSON text

@@ -47,4 +47,14 @@ struct Fetch {
   std::string ifModifiedSince, lastModified, userAgent;
 };
 
+// Whatever else came in: a datagram of the dashboard feed, or log data.
+struct Arrival {
+  enum class Kind : uint8_t { line, log };
+  int64_t id = 0;
+  Kind kind = Kind::line;
+  double received = 0;
+  bool good = false;
+  std::string json;  // an object
+};
+
 }  // namespace kyt::devserver

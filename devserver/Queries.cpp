@@ -112,6 +112,8 @@ Reply Queries::answer(const Request& request) {
   if (path == "/sessions") return sessions(request);
   if (path == "/counts") return counts(request);
   if (path == "/storebags") return storebags(request);
+  if (path == "/lines") return arrivals(request, Arrival::Kind::line);
+  if (path == "/logs") return arrivals(request, Arrival::Kind::log);
   if (path == "/totals") return json(totalsAsJson(store_.totals()));
   if (path.starts_with("/posts/")) {
     std::string_view rest = path.substr(7);
@@ -254,6 +256,23 @@ Reply Queries::storebags(const Request& request) {
       fetchObject(out, Fetch{row.integer(0), row.real(1), row.integer(2) != 0, text(3), text(4), text(5),
                              static_cast<unsigned>(row.integer(6)), text(7), text(8), text(9)});
     }
+    return json(out.endArray().endObject().text());
+  });
+}
+
+Reply Queries::arrivals(const Request& request, Arrival::Kind kind) {
+  const bool onward = request.argument("since").has_value();
+  return store_.read([&](Database& database) {
+    Statement row = database.prepare(
+        std::string("SELECT id, received, good, json FROM arrivals WHERE kind = ? AND id > ? ORDER BY id ") +
+        (onward ? "ASC" : "DESC") + " LIMIT ?");
+    row.bind(int64_t{kind == Arrival::Kind::line ? 0 : 1}).bind(numberArgument(request, "since", 0));
+    row.bind(limitOf(request));
+    JsonText out;
+    out.object().key(kind == Arrival::Kind::line ? "lines" : "logs").array();
+    while (row.step())
+      arrivalObject(
+          out, Arrival{row.integer(0), kind, row.real(1), row.integer(2) != 0, std::string(row.text(3))});
     return json(out.endArray().endObject().text());
   });
 }

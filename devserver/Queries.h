@@ -28,6 +28,7 @@ class Queries {
   [[nodiscard]] Reply sessions(const Request& request);
   [[nodiscard]] Reply counts(const Request& request);
   [[nodiscard]] Reply storebags(const Request& request);
+  [[nodiscard]] Reply arrivals(const Request& request, Arrival::Kind kind);
 
   Store& store_;
   const PostChecker& checker_;

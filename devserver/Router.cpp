@@ -5,6 +5,7 @@
 #include <algorithm>
 
 #include "devserver/JsonText.h"
+#include "devserver/LogData.h"
 #include "devserver/Page.h"
 #include "devserver/Rows.h"
 #include "devserver/Text.h"
@@ -81,22 +82,28 @@ Reply verdict(const Post& post, unsigned status) {
 }  // namespace
 
 Router::Router(const Options& options, Store& store, const PostChecker& checker, EventStream& stream,
-               Suspensions& suspensions, std::optional<BagSigner> signer)
+               Suspensions& suspensions, AcknowledgementRules& acknowledgements,
+               std::optional<BagSigner> signer)
     : options_(options),
       store_(store),
       checker_(checker),
       stream_(stream),
       suspensions_(suspensions),
+      acknowledgements_(acknowledgements),
       queries_(store, checker),
       storebags_(options.bags, options.maxAge, std::move(signer)),
       pagePolicy_(policyOfPage()) {}
 
 uint64_t Router::bodyLimit(const Request& request) const {
-  return takesPosts(request) ? options_.maxBodyBytes : kMaxControlBytes;
+  return takesPosts(request) || takesLogData(request) ? options_.maxBodyBytes : kMaxControlBytes;
 }
 
 bool Router::takesPosts(const Request& request) const {
   return isBelow(request.path, "/events") && (request.secure || options_.httpEvents);
+}
+
+bool Router::takesLogData(const Request& request) const {
+  return isBelow(request.path, "/logdata") && (request.secure || options_.httpEvents);
 }
 
 // The page and its queries answer only to a browser that opened the page itself, and to programs: no other
@@ -116,6 +123,7 @@ bool Router::comesFromThisPlace(const Request& request) const {
 Answer Router::answer(Request& request) {
   const std::string_view path = request.path;
   if (takesPosts(request)) return answerEvents(request);
+  if (takesLogData(request)) return answerLogData(request);
   if (isBelow(path, "/storebags/tolvar") || isBelow(path, "/bags/tolvar")) return answerStorebag(request);
   if (request.secure) return text(404, "nothing is here");
   if (!comesFromThisPlace(request)) return text(403, "this answers only to its own page and to programs");
@@ -151,6 +159,27 @@ Answer Router::answerEvents(Request& request) {
   post.answered = unanswered ? 0 : rule && rule->status ? *rule->status : reply.status;
   store_.add(std::move(post));
   return applyRule(rule, std::move(reply));
+}
+
+// Good log data is answered with the place where it can be found, which is named after its content.
+Answer Router::answerLogData(Request& request) {
+  if (request.method != "POST") return notAllowed("POST");
+  Reply reply =
+      text(413, "the body is over the limit of " + std::to_string(options_.maxBodyBytes) + " bytes");
+  if (!request.tooLarge) {
+    const std::string* host = request.header("Host");
+    const LogData data = readLogData(request.body);
+    const std::string location = std::string(request.secure ? "https" : "http") + "://" +
+                                 validText(host != nullptr ? *host : "localhost") + "/logdata/" + data.name;
+    reply =
+        data.reason.empty() ? Reply{200, location, "text/plain; charset=utf-8", {}} : text(400, data.reason);
+    JsonText json;
+    json.object().member("path", request.path).member("secure", request.secure);
+    json.member("size", request.body.size()).member("location", data.reason.empty() ? location : "");
+    json.member("reason", data.reason).member("entries", data.entries).key("data").json(data.json);
+    store_.add(Arrival{0, Arrival::Kind::log, timeNow(), data.reason.empty(), json.endObject().text()});
+  }
+  return applyRule(rules_.take(request.path), std::move(reply));
 }
 
 void Router::broken(Request& request) {
@@ -238,14 +267,30 @@ Answer Router::answerControl(const Request& request) {
     if (const auto* wrong = std::get_if<std::string>(&rule)) return text(400, *wrong);
     rules_.add(std::move(std::get<ReplyRule>(rule)));
   } else if ((path == "/control/reply" && request.method == "DELETE") || path == "/control/reset") {
+    if (path == "/control/reset") acknowledgements_.clear();
     rules_.clear();
     suspensions_.wake(WaitFor::rules);
   } else if (path == "/control/clear" && (request.method == "PUT" || request.method == "POST")) {
     store_.clear();
+  } else if (path == "/control/acknowledgements") {
+    return answerAcknowledgements(request);
   } else if (path != "/control/reply" || !isRead(request)) {
     return text(404, "no such control");
   }
   return Reply{200, rules_.asJson(), "application/json", {{"Cache-Control", "no-store"}}};
+}
+
+Answer Router::answerAcknowledgements(const Request& request) {
+  if (request.method == "PUT") {
+    auto rule = AcknowledgementRules::parse(request.body);
+    if (const auto* wrong = std::get_if<std::string>(&rule)) return text(400, *wrong);
+    acknowledgements_.add(std::get<AcknowledgementRule>(rule));
+  } else if (request.method == "DELETE") {
+    acknowledgements_.clear();
+  } else if (!isRead(request)) {
+    return notAllowed("GET, HEAD, PUT, DELETE");
+  }
+  return Reply{200, acknowledgements_.asJson(), "application/json", {{"Cache-Control", "no-store"}}};
 }
 
 // Answers as soon as as many events, posts, bad posts and storebag fetches are there as the request names.
@@ -255,13 +300,16 @@ Answer Router::answerWait(const Request& request) {
     return argument ? parseInteger(*argument).value_or(-1) : otherwise;
   };
   const int64_t events = number("events", 0), posts = number("posts", 0), bad = number("bad", 0);
-  const int64_t fetches = number("fetches", 0), timeout = number("timeout", kDefaultWaitSeconds);
-  if (std::min({events, posts, bad, fetches, timeout}) < 0) return text(400, "an argument is no number");
-  const auto poll = [this, request, events, posts, bad, fetches](bool expired) -> std::optional<Reply> {
+  const int64_t fetches = number("fetches", 0), lines = number("lines", 0), logs = number("logs", 0);
+  const int64_t timeout = number("timeout", kDefaultWaitSeconds);
+  if (std::min({events, posts, bad, fetches, lines, logs, timeout}) < 0)
+    return text(400, "an argument is no number");
+  const auto poll = [this, request, events, posts, bad, fetches, lines,
+                     logs](bool expired) -> std::optional<Reply> {
     const Totals totals = store_.totals();
     const int64_t fitting = Queries::hasFilters(request) ? queries_.countEvents(request) : totals.events;
-    const bool reached =
-        fitting >= events && totals.posts >= posts && totals.bad >= bad && totals.fetches >= fetches;
+    const bool reached = fitting >= events && totals.posts >= posts && totals.bad >= bad &&
+                         totals.fetches >= fetches && totals.lines >= lines && totals.logs >= logs;
     if (!reached && !expired) return std::nullopt;
     JsonText out;
     out.object().member("reached", reached).member("events", fitting);

@@ -4,6 +4,7 @@
 
 #include <string>
 
+#include "devserver/AcknowledgementRules.h"
 #include "devserver/EventStream.h"
 #include "devserver/Http.h"
 #include "devserver/Options.h"
@@ -19,7 +20,7 @@ namespace kyt::devserver {
 class Router final : public HttpHandler {
  public:
   Router(const Options& options, Store& store, const PostChecker& checker, EventStream& stream,
-         Suspensions& suspensions, std::optional<BagSigner> signer);
+         Suspensions& suspensions, AcknowledgementRules& acknowledgements, std::optional<BagSigner> signer);
 
   [[nodiscard]] uint64_t bodyLimit(const Request& request) const override;
   [[nodiscard]] Answer answer(Request& request) override;
@@ -28,9 +29,12 @@ class Router final : public HttpHandler {
  private:
   [[nodiscard]] bool takesPosts(const Request& request) const;
   [[nodiscard]] bool comesFromThisPlace(const Request& request) const;
+  [[nodiscard]] bool takesLogData(const Request& request) const;
   [[nodiscard]] Answer answerEvents(Request& request);
+  [[nodiscard]] Answer answerLogData(Request& request);
   [[nodiscard]] Answer answerStorebag(const Request& request);
   [[nodiscard]] Answer answerControl(const Request& request);
+  [[nodiscard]] Answer answerAcknowledgements(const Request& request);
   [[nodiscard]] Answer answerWait(const Request& request);
   [[nodiscard]] Answer answerStream();
   [[nodiscard]] Reply page() const;
@@ -42,6 +46,7 @@ class Router final : public HttpHandler {
   const PostChecker& checker_;
   EventStream& stream_;
   Suspensions& suspensions_;
+  AcknowledgementRules& acknowledgements_;
   Queries queries_;
   ReplyRules rules_;
   Storebags storebags_;

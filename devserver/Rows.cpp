@@ -61,10 +61,16 @@ void fetchObject(JsonText& out, const Fetch& fetch) {
   out.member("lastModified", fetch.lastModified).member("userAgent", fetch.userAgent).endObject();
 }
 
+void arrivalObject(JsonText& out, const Arrival& arrival) {
+  out.object().member("id", arrival.id).member("received", arrival.received).member("good", arrival.good);
+  out.key("content").json(arrival.json).endObject();
+}
+
 std::string totalsAsJson(const Totals& totals) {
   JsonText out;
   out.object().member("posts", totals.posts).member("bad", totals.bad).member("events", totals.events);
-  return out.member("fetches", totals.fetches).endObject().text();
+  out.member("fetches", totals.fetches).member("lines", totals.lines).member("logs", totals.logs);
+  return out.endObject().text();
 }
 
 std::string commitAsJson(const Commit& commit) {
@@ -89,6 +95,11 @@ std::string commitAsJson(const Commit& commit) {
   }
   out.endArray().key("fetches").array();
   for (const Fetch& fetch : commit.fetches) fetchObject(out, fetch);
+  for (const auto kind : {Arrival::Kind::line, Arrival::Kind::log}) {
+    out.endArray().key(kind == Arrival::Kind::line ? "lines" : "logs").array();
+    for (const Arrival& arrival : commit.arrivals)
+      if (arrival.kind == kind) arrivalObject(out, arrival);
+  }
   return out.endArray().endObject().text();
 }
 

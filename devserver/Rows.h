@@ -31,6 +31,8 @@ void eventObject(JsonText& out, const Event& event, const Post& post);
 void eventObject(JsonText& out, const Statement& row);
 void fetchObject(JsonText& out, const Fetch& fetch);
 
+void arrivalObject(JsonText& out, const Arrival& arrival);
+
 [[nodiscard]] std::string totalsAsJson(const Totals& totals);
 
 // What pages are told about a transaction: its posts, fetches and the last of its events.

@@ -9,6 +9,8 @@ namespace kyt::devserver {
 namespace {
 
 constexpr int64_t kKeptFetches = 10000;
+constexpr int64_t kKeptLines = 10000;
+constexpr int64_t kKeptLogs = 200;  // each may be as large as a post
 
 constexpr char kTables[] = R"sql(
 PRAGMA journal_mode = WAL;
@@ -30,6 +32,9 @@ CREATE INDEX IF NOT EXISTS events_received ON events(received, client, method);
 CREATE TABLE IF NOT EXISTS fetches (
   id INTEGER PRIMARY KEY AUTOINCREMENT, time REAL, secure INTEGER, name TEXT, path TEXT, version TEXT, status INTEGER,
   if_modified_since TEXT, last_modified TEXT, user_agent TEXT);
+CREATE TABLE IF NOT EXISTS arrivals (
+  id INTEGER PRIMARY KEY AUTOINCREMENT, kind INTEGER, received REAL, good INTEGER, json TEXT);
+CREATE INDEX IF NOT EXISTS arrivals_kind ON arrivals(kind, id);
 )sql";
 
 std::string headersAsJson(const std::vector<Header>& headers) {
@@ -78,11 +83,14 @@ Store::Store(std::unique_ptr<Database> writer, std::unique_ptr<Database> reader,
       insertPost_(writer_->prepare("INSERT INTO posts VALUES(NULL,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)")),
       insertEvent_(writer_->prepare("INSERT INTO events VALUES(NULL,?,?,?,?,?,?,?,?,?,?,?)")),
       insertFetch_(writer_->prepare("INSERT INTO fetches VALUES(NULL,?,?,?,?,?,?,?,?,?)")),
+      insertArrival_(writer_->prepare("INSERT INTO arrivals VALUES(NULL,?,?,?,?)")),
       reader_(std::move(reader)) {
   writtenTotals_ = {writer_->number("SELECT count(*) FROM posts"),
                     writer_->number("SELECT count(*) FROM posts WHERE NOT good"),
                     writer_->number("SELECT count(*) FROM events"),
-                    writer_->number("SELECT count(*) FROM fetches")};
+                    writer_->number("SELECT count(*) FROM fetches"),
+                    writer_->number("SELECT count(*) FROM arrivals WHERE kind = 0"),
+                    writer_->number("SELECT count(*) FROM arrivals WHERE kind = 1")};
   keptPosts_ = static_cast<uint64_t>(writtenTotals_.posts);
   keptBytes_ = static_cast<uint64_t>(writer_->number("SELECT sum(size + text_size) FROM posts"));
   totals_ = writtenTotals_;
@@ -111,6 +119,15 @@ void Store::add(Post post) {
 void Store::add(Fetch fetch) {
   MutexLock lock(mutex_);
   pending_.fetches.push_back(std::move(fetch));
+  ++added_;
+  changed_.notify_all();
+}
+
+void Store::add(Arrival arrival) {
+  MutexLock lock(mutex_);
+  while (pending_.bytes > kMaxQueuedBytes) changed_.wait(mutex_);
+  pending_.bytes += arrival.json.size() + 256;
+  pending_.arrivals.push_back(std::move(arrival));
   ++added_;
   changed_.notify_all();
 }
@@ -158,19 +175,21 @@ void Store::writeLoop() {
       totals_ = writtenTotals_;
       changed_.notify_all();
     }
-    committed_(Commit{std::move(pending.posts), std::move(pending.fetches), writtenTotals_});
+    committed_(Commit{std::move(pending.posts), std::move(pending.fetches), std::move(pending.arrivals),
+                      writtenTotals_});
   }
 }
 
 void Store::write(Pending& pending) {
   writer_->execute("BEGIN IMMEDIATE");
   if (pending.clear) {
-    writer_->execute("DELETE FROM events; DELETE FROM posts; DELETE FROM fetches");
+    writer_->execute("DELETE FROM events; DELETE FROM posts; DELETE FROM fetches; DELETE FROM arrivals");
     writtenTotals_ = Totals();
     keptPosts_ = keptBytes_ = 0;
   }
   for (Post& post : pending.posts) writePost(post);
   for (Fetch& fetch : pending.fetches) writeFetch(fetch);
+  for (Arrival& arrival : pending.arrivals) writeArrival(arrival);
   applyRetention();
   if (!writer_->execute("COMMIT")) writer_->execute("ROLLBACK");
 }
@@ -221,6 +240,25 @@ void Store::writeFetch(Fetch& fetch) {
   if (fetch.id > kKeptFetches && fetch.id % 100 == 0) {
     writer_->prepare("DELETE FROM fetches WHERE id <= ?").bind(fetch.id - kKeptFetches).run();
   }
+}
+
+void Store::writeArrival(Arrival& arrival) {
+  const bool isLine = arrival.kind == Arrival::Kind::line;
+  const int64_t kind = isLine ? 0 : 1;
+  insertArrival_.bind(kind).bind(arrival.received).bind(int64_t{arrival.good}).bind(arrival.json);
+  if (!insertArrival_.run()) return;
+  arrival.id = writer_->lastInsertedRow();
+  int64_t& total = isLine ? writtenTotals_.lines : writtenTotals_.logs;
+  total += 1;
+  const int64_t kept = isLine ? kKeptLines : kKeptLogs;
+  if (total <= kept || total % 100 != 0) return;
+  writer_
+      ->prepare(
+          "DELETE FROM arrivals WHERE kind = ?1 AND id <= "
+          "(SELECT id FROM arrivals WHERE kind = ?1 ORDER BY id DESC LIMIT 1 OFFSET ?2)")
+      .bind(kind)
+      .bind(kept)
+      .run();
 }
 
 void Store::applyRetention() {

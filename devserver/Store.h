@@ -1,4 +1,5 @@
-// Everything that came in, in SQLite: posts, their events, fetches of storebags.
+// Everything that came in, in SQLite: posts, their events, fetches of storebags,
+// lines of the dashboard feed, log data.
 //
 // Additions are queued and written by one thread, all that waits in one transaction, so that a flood of posts
 // costs few commits; an addition waits only while more than `kMaxQueuedBytes` are queued. Queries first wait
@@ -22,13 +23,15 @@
 namespace kyt::devserver {
 
 struct Totals {
-  int64_t posts = 0, bad = 0, events = 0, fetches = 0;  // since the store was made or cleared
+  int64_t posts = 0, bad = 0, events = 0, fetches = 0, lines = 0,
+          logs = 0;  // since the store was made or cleared
 };
 
 // What one transaction wrote.
 struct Commit {
   std::vector<Post> posts;
   std::vector<Fetch> fetches;
+  std::vector<Arrival> arrivals;
   Totals totals;
 };
 
@@ -49,6 +52,7 @@ class Store {
 
   void add(Post post) EXCLUDES(mutex_);
   void add(Fetch fetch) EXCLUDES(mutex_);
+  void add(Arrival arrival) EXCLUDES(mutex_);
   void clear() EXCLUDES(mutex_);
   [[nodiscard]] Totals totals() EXCLUDES(mutex_);
 
@@ -64,6 +68,7 @@ class Store {
   struct Pending {
     std::vector<Post> posts;
     std::vector<Fetch> fetches;
+    std::vector<Arrival> arrivals;
     size_t bytes = 0;
     bool clear = false;
   };
@@ -75,6 +80,7 @@ class Store {
   void write(Pending& pending);
   void writePost(Post& post);
   void writeFetch(Fetch& fetch);
+  void writeArrival(Arrival& arrival);
   void applyRetention();
 
   // Constant after construction.
@@ -82,7 +88,7 @@ class Store {
   const std::function<void(const Commit&)> committed_;
   // The writer's thread alone.
   std::unique_ptr<Database> writer_;
-  Statement insertPost_, insertEvent_, insertFetch_;
+  Statement insertPost_, insertEvent_, insertFetch_, insertArrival_;
   uint64_t keptPosts_ = 0, keptBytes_ = 0;
   Totals writtenTotals_;
 

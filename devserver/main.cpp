@@ -14,6 +14,7 @@
 #include <system_error>
 
 #include "devserver/Certificates.h"
+#include "devserver/DashboardFeed.h"
 #include "devserver/Files.h"
 #include "devserver/HttpServer.h"
 #include "devserver/JsonText.h"
@@ -53,10 +54,11 @@ void describe(CLI::App& app, Options& options, std::vector<std::string>& digestK
       ->capture_default_str();
   app.add_option("--http-port", options.httpPort, "Port of the page and the queries; 0: any free one")
       ->capture_default_str();
+  app.add_option("--udp-port", options.udpPort, "Port of the dashboard feed (UDP); 0: any free one");
   app.add_option("--listen", options.listen, "Address to listen on")->capture_default_str();
   app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)");
   app.add_option("--ready-file", options.readyFile, "Written when the ports are open: their numbers as JSON");
-  app.add_flag("--http-events", options.httpEvents, "Take event posts on the plain port too");
+  app.add_flag("--http-events", options.httpEvents, "Take event posts and log data on the plain port too");
   app.add_option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control")->capture_default_str();
   app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)");
   app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post as sent")->capture_default_str();
@@ -94,9 +96,11 @@ void raiseDescriptorLimit() {
   setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-std::string readyText(const Options& options, const HttpServer& https, const HttpServer& http) {
+std::string readyText(const Options& options, const HttpServer& https, const HttpServer& http,
+                      const DashboardFeed* feed) {
   JsonText out;
   out.object().member("https", https.port()).member("http", http.port()).member("listen", options.listen);
+  if (feed != nullptr) out.member("udp", feed->port());
   out.member("ca", std::filesystem::absolute(options.state / "ca.pem").string())
       .member("pid", int64_t{getpid()});
   return out.endObject().text() + "\n";
@@ -127,15 +131,20 @@ int serve(const Options& options, const sigset_t& signals) {
                                                    {options.keepPosts, options.keepBytes}, committed, error);
   if (!store) return fail(error);
   const PostChecker checker(options.digestKeys, options.maxInflatedBytes);
-  Router router(options, *store, checker, stream, suspensions, signer);
+  AcknowledgementRules acknowledgements;
+  Router router(options, *store, checker, stream, suspensions, acknowledgements, signer);
   const auto https = HttpServer::start(options, options.httpsPort, &std::get<Identity>(identity), router,
                                        suspensions, error);
   const auto http =
       https ? HttpServer::start(options, options.httpPort, nullptr, router, suspensions, error) : nullptr;
 
+  std::unique_ptr<DashboardFeed> feed;
+  if (http && options.udpPort)
+    feed = DashboardFeed::start(options.listen, *options.udpPort, *store, acknowledgements, error);
+
   int status = 0;
-  if (http) {
-    const std::string ready = readyText(options, *https, *http);
+  if (http && (feed || !options.udpPort)) {
+    const std::string ready = readyText(options, *https, *http, feed.get());
     if (!options.readyFile.empty() && !replaceFile(options.readyFile, ready, 0644)) {
       status = fail("can't write " + options.readyFile.string() + ": " + std::strerror(errno));
     } else {

@@ -68,6 +68,10 @@ TimerHandle ManualTimers::every(Duration period, Duration, std::shared_ptr<Seria
 
 TimerHandle ManualTimers::arm(Duration delay, Duration period, std::shared_ptr<SerialQueue> queue,
                               Task work) {
+  if (refuses) {
+    queues.push_back(queue);
+    return {};
+  }
   auto shared = std::make_shared<Work>(Work{std::move(work)});
   const MonotonicTime due = clock_.monotonic() + delay;
   MutexLock lock(shared_->mutex);

@@ -5,6 +5,7 @@
 #pragma once
 
 #include <memory>
+#include <vector>
 
 #include "platform/Timer.h"
 #include "platform/fake/ManualClock.h"
@@ -22,6 +23,9 @@ class ManualTimers final : public TimerService {
   // advance(), and `afterEach` (drain the executor, say) after each due time and at the end.
   void advance(Duration duration, Task afterEach);
   [[nodiscard]] size_t pending() const;  // timers that are armed
+  // From now on handles are empty, and `queues` notes what was asked for.
+  bool refuses = false;
+  std::vector<std::weak_ptr<SerialQueue>> queues;
 
  private:
   struct Shared;

@@ -64,6 +64,7 @@ class ManualReactor::Registration final : public Watch::State {
 };
 
 Watch ManualReactor::watch(int descriptor, unsigned events, Handler handler) {
+  if (refuses) return {};
   auto registration = std::make_shared<Registration>(events, std::move(handler));
   watches_[descriptor] = registration;
   return Watch(std::move(registration));

@@ -125,6 +125,7 @@ ServerProcess::ServerProcess(const std::filesystem::path& state, std::vector<std
   }
   httpsPort_ = static_cast<uint16_t>(ready["https"].GetUint());
   httpPort_ = static_cast<uint16_t>(ready["http"].GetUint());
+  if (ready.HasMember("udp")) udpPort_ = static_cast<uint16_t>(ready["udp"].GetUint());
 }
 
 ServerProcess::~ServerProcess() {

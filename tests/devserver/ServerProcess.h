@@ -62,6 +62,7 @@ class ServerProcess {
   [[nodiscard]] bool isReady() const { return httpPort_ != 0; }
   [[nodiscard]] uint16_t httpsPort() const { return httpsPort_; }
   [[nodiscard]] uint16_t httpPort() const { return httpPort_; }
+  [[nodiscard]] uint16_t udpPort() const { return udpPort_; }  // 0: without --udp-port
   [[nodiscard]] std::string caFile() const { return (state_ / "ca.pem").string(); }
   [[nodiscard]] const std::string& errors() const { return errors_; }  // complete after the end
 
@@ -79,7 +80,7 @@ class ServerProcess {
   std::filesystem::path state_;
   pid_t pid_ = -1;
   int output_ = -1, errorsFile_ = -1;
-  uint16_t httpsPort_ = 0, httpPort_ = 0;
+  uint16_t httpsPort_ = 0, httpPort_ = 0, udpPort_ = 0;
   int status_ = -1;
   std::string errors_;
 };

@@ -110,6 +110,7 @@ std::optional<Error> Stage::startServer() {
   if (const Dictionary* numbers = ports.dictionary()) {
     if (const Value* https = numbers->find("https")) httpsPort_ = https->longLongValue();
     if (const Value* http = numbers->find("http")) httpPort_ = http->longLongValue();
+    if (const Value* udp = numbers->find("udp")) udpPort_ = udp->longLongValue();
   }
   if (httpsPort_ == 0 || httpPort_ == 0) return failure("the development server's ready file names no ports");
   return std::nullopt;

@@ -61,6 +61,8 @@ class Stage {
   [[nodiscard]] std::string serverLog() const { return options_.folder + "/server.log"; }
   [[nodiscard]] std::string httpsBase() const { return "https://127.0.0.1:" + std::to_string(httpsPort_); }
   [[nodiscard]] std::string httpBase() const { return "http://127.0.0.1:" + std::to_string(httpPort_); }
+  // Of the dashboard feed, when the server's arguments ask for it.
+  [[nodiscard]] long udpPort() const { return udpPort_; }
 
  private:
   explicit Stage(Options options) : options_(std::move(options)) {}
@@ -70,7 +72,7 @@ class Stage {
 
   Options options_;
   std::string privateKey_;
-  long httpsPort_ = 0, httpPort_ = 0;
+  long httpsPort_ = 0, httpPort_ = 0, udpPort_ = 0;
   std::optional<ChildProcess> server_, daemon_;
 };
 

@@ -117,37 +117,14 @@ TEST_F(Dashboard, WithoutAConnectionIsNotMadeAndLeavesNothing) {
   EXPECT_EQ(platform_.executor.pending(), 0u);
 }
 
-class NoTimers final : public TimerService {
- public:
-  TimerHandle after(Duration, std::shared_ptr<SerialQueue>, Task) override { return {}; }
-  TimerHandle every(Duration, Duration, std::shared_ptr<SerialQueue> queue, Task) override {
-    asked = queue;
-    return {};
-  }
-  std::weak_ptr<SerialQueue> asked;
-};
-
-class NoReactor final : public Reactor {
- public:
-  Watch watch(int, unsigned, Handler) override { return {}; }
-};
-
-// The platform with other timers and another reactor.
-Platform with(const Platform& p, TimerService& timers, Reactor& reactor) {
-  return {p.limits,  p.counters,     p.log,           p.clock,        timers,
-          reactor,   p.executor,     p.random,        p.userDefaults, p.deviceProperties,
-          p.consent, p.cryptography, p.propertyLists, p.json,         p.deflate,
-          p.memory,  p.urlSessions,  p.udpSockets,    p.clientBundle, p.daemonBundle};
-}
-
 TEST_F(Dashboard, WithoutATimerIsNotMadeAndLeavesNothing) {
-  NoTimers timers;
-  Platform platform = with(platform_.platform, timers, platform_.reactor);
-  EXPECT_EQ(DashboardBackend::initWithName(platform, "dashboard", reliable(), std::nullopt), nullptr);
+  platform_.timers.refuses = true;
+  EXPECT_EQ(make(reliable()), nullptr);
   EXPECT_EQ(errors("DashboardBackend(initWithName): can't create timer source."), 1u);
   EXPECT_EQ(platform_.udpSockets.openSockets(), 0u);
   EXPECT_EQ(platform_.reactor.waitsFor(socket().descriptor), 0u);
-  EXPECT_TRUE(timers.asked.expired());  // the network queue is gone
+  ASSERT_EQ(platform_.timers.queues.size(), 1u);
+  EXPECT_TRUE(platform_.timers.queues[0].expired());  // the network queue is gone
 }
 
 TEST_F(Dashboard, ThatCannotBindStaysUnreliable) {
@@ -161,10 +138,8 @@ TEST_F(Dashboard, ThatCannotBindStaysUnreliable) {
 }
 
 TEST_F(Dashboard, ThatCannotListenIsReliableAllTheSame) {
-  NoReactor reactor;
-  Platform platform = with(platform_.platform, platform_.timers, reactor);
-  backend_ = DashboardBackend::initWithName(platform, "dashboard", reliable(), std::nullopt);
-  ASSERT_NE(backend_, nullptr);
+  platform_.reactor.refuses = true;
+  ASSERT_NE(make(reliable()), nullptr);
   EXPECT_EQ(errors("DashboardBackend(useReliableUDP): can't create read source"), 1u);
   EXPECT_TRUE(backend_->reliableUDP());
   send(1);
