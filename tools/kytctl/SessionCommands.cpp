@@ -1,19 +1,22 @@
 // Events by hand: one alone, or a scripted session.
 #include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
+#include <cstring>
+#include <fstream>
 #include <functional>
+#include <iostream>
 #include <map>
 #include <mutex>
-#include <sstream>
 #include <thread>
 
 #include "kytreporting/KYTReporting.h"
 #include "platform/DataServices.h"
+#include "platform/TextEscape.h"
 #include "platform/linux/RapidJSONWriter.h"
-#include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {
@@ -50,6 +53,34 @@ class Answer {
   bool set_ = false;
 };
 
+// The messages that an aggregating session gets, printed as they come, each a line of JSON. Shared: they come
+// on the library's thread, and the last may come while the session closes.
+class Aggregated {
+ public:
+  void print(const AggregatedMessage& message) {
+    Dictionary line{{"timestamp", message.timestamp},
+                    {"category", static_cast<unsigned>(message.category)},
+                    {"type", static_cast<unsigned>(message.type)}};
+    if (message.sessionInfo) line.set("sessionInfo", *message.sessionInfo);
+    if (message.payload) line.set("payload", *message.payload);
+    const std::string text = escapedText(description(Dictionary{{"aggregated", std::move(line)}}));
+    std::printf("%s\n", text.c_str());
+    std::fflush(stdout);
+    const std::lock_guard lock(mutex_);
+    ++count_;
+    changed_.notify_all();
+  }
+  [[nodiscard]] bool waitFor(uint64_t count, double seconds) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, std::chrono::duration<double>(seconds), [&] { return count_ >= count; });
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  uint64_t count_ = 0;
+};
+
 std::string socketPath(const ConnectionOptions& connection) {
   if (!connection.socket.empty()) return connection.socket;
   if (connection.root.empty()) return {};
@@ -83,6 +114,7 @@ class Script {
               {"displayURL", &Script::displayURL},
               {"sharedData", &Script::sharedData},
               {"digestKey", &Script::digestKey},
+              {"wait", &Script::wait},
               {"finish", &Script::finish}};
   }
 
@@ -111,8 +143,16 @@ class Script {
     options.socketPath = socketPath(connection_);
     options.sessionInfo = dictionaryAt(step, "sessionInfo").value_or(Dictionary());
     options.userInfo = dictionaryAt(step, "userInfo");
+    if (const Value* aggregate = step.find("aggregate"); aggregate != nullptr && aggregate->boolValue())
+      options.aggregationBlock = [aggregated = aggregated_](const AggregatedMessage& message) {
+        aggregated->print(message);
+      };
     session_ = KYTReporting::open(std::move(options));
     return 0;
+  }
+  int wait(const Dictionary& step) {
+    if (aggregated_->waitFor(numberAt(step, "messages", 1), connection_.timeoutSeconds)) return 0;
+    return failed("wait: not so many messages in time");
   }
   int configure(const Dictionary&) {
     auto answer = std::make_shared<Answer>();
@@ -203,6 +243,7 @@ class Script {
   }
 
   const ConnectionOptions& connection_;
+  const std::shared_ptr<Aggregated> aggregated_ = std::make_shared<Aggregated>();
   std::map<std::string, int (Script::*)(const Dictionary&)> steps_;
   std::unique_ptr<KYTReporting> session_;
 };
@@ -241,11 +282,15 @@ int sendCommand(const ConnectionOptions& connection, const SendOptions& given) {
 }
 
 int sessionCommand(const ConnectionOptions& connection, const std::string& path) {
-  auto text = readFile(path);
-  if (auto* error = std::get_if<Error>(&text)) return failed(*error);
+  // Line by line, so that a person or a program may decide on the next step after the last one's answer.
+  std::ifstream file;
+  if (path != "-") {
+    file.open(path);
+    if (!file) return failed(path + ": " + std::strerror(errno));
+  }
+  std::istream& lines = path == "-" ? std::cin : file;
   RapidJSONWriter json;
   Script script(connection);
-  std::istringstream lines(std::get<std::string>(text));
   std::string line;
   for (int number = 1; std::getline(lines, line); ++number) {
     if (line.find_first_not_of(" \t\r") == std::string::npos || line[line.find_first_not_of(" \t")] == '#')

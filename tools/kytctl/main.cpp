@@ -44,9 +44,13 @@ void addSend(CLI::App& app, Arguments& a) {
   addConnectionOptions(*session, a);
   session->add_option("script", a.script, "a file, or - for standard input")->required();
   session->footer(
-      "Steps, by \"do\":\n"
+      "Steps, by \"do\"; from standard input each runs as soon as its line is there:\n"
       "  {\"do\":\"open\",\"sessionInfo\":{…},\"userInfo\":{…}}      first; the keys are SessionID, "
-      "ClientType, …\n"
+      "ClientType, …;\n"
+      "                                                          \"aggregate\":true prints each message "
+      "of the hierarchy\n"
+      "  {\"do\":\"wait\",\"messages\":1}                            until so many of those have been "
+      "printed\n"
       "  {\"do\":\"configure\"}                                    prints the live back ends\n"
       "  {\"do\":\"states\",\"userInfo\":{…}}                        new user information; prints the live "
       "back ends\n"
