@@ -144,9 +144,10 @@ std::shared_ptr<ReportingdSession> ReportingdAgent::getAncestorWithAggregatorFor
 }
 
 void ReportingdAgent::updateDownstreamSessions(ReportingdSession& session) {
-  MonitorLock lock(monitor_);
+  // A standalone session must not wait for somebody's download.
   const std::optional<String> token = session.hierarchyToken();
   if (!token) return;
+  MonitorLock lock(monitor_);
   session.updateCombinedSessionID();
   session.syncReportingStates();
   bool upstreamAggregator = false;

@@ -81,6 +81,7 @@ void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
   _sessionInfo = sessionInfo;
   _hierarchyDictionary.reset();
   if (token != nullptr && token->isDictionary()) _hierarchyDictionary = *token->dictionary();
+  if (_hierarchyDictionary) wasInHierarchy_ = true;
   _sessionDelegate.updateCorrelatedSessions(*this);
 }
 

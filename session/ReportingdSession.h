@@ -162,6 +162,7 @@ class ReportingdSession final : public ClientSessionInterface,
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()
   std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
+  bool wasInHierarchy_ = false;  // a session that drops its token stays where it is registered
   bool ended_ = false;
 };
 

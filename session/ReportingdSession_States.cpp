@@ -8,9 +8,11 @@
 
 namespace kyt {
 
-// Under the monitor, because other sessions of the hierarchy read and write the same states and thresholds.
+// Under the monitor, because other sessions of the hierarchy read and write the same states and thresholds. A
+// session that never was in one need not wait for the monitor, which somebody's download may hold.
 void ReportingdSession::updateReportingStates() {
-  MonitorLock lock(_sessionDelegate.monitor());
+  std::optional<MonitorLock> lock;
+  if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
   for (const auto& [key, backend] : _backends) backend->updateState();
 }
 
