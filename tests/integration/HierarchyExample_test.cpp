@@ -1,0 +1,66 @@
+// The worked example of docs/PROGRAMS.md, as it stands there.
+#include <sstream>
+
+#include "tests/integration/HierarchyFixture.h"
+
+namespace kyt {
+namespace {
+
+class HierarchyExample : public HierarchyTest {
+ protected:
+  // The lines of the block that begins with "```jsonl example=NAME".
+  static std::vector<std::string> example(const std::string& name) {
+    std::istringstream document(contents(std::string(KYT_DOCUMENTS) + "/PROGRAMS.md"));
+    std::vector<std::string> lines;
+    bool inside = false;
+    for (std::string line; std::getline(document, line);) {
+      if (inside && line == "```") break;
+      if (inside) lines.push_back(line);
+      if (line == "```jsonl example=" + name) inside = true;
+    }
+    return lines;
+  }
+};
+
+TEST_F(HierarchyExample, DoesWhatTheGuideSays) {
+  lay();
+  putBag("cadmor", {entry("call"), entry("stream")});
+  startDaemon();
+  const Process call = process(), stream = process();
+  ASSERT_EQ(example("call").size(), 6U);
+  ASSERT_EQ(example("stream").size(), 4U);
+  for (const std::string& line : example("call")) call->step(line);
+  const std::string own = call->line();
+  EXPECT_NE(own.find("\"category\":0,\"type\":0"), std::string::npos) << own;
+  EXPECT_EQ(call->line(), "live: httppost");
+
+  for (const std::string& line : example("stream")) stream->step(line);
+  EXPECT_EQ(stream->line(), "live: httppost");
+  EXPECT_EQ(stream->line(), "sent 2, lost 0, dropped 0");
+  EXPECT_EQ(stream->end(), std::vector<std::string>{"status 0"});
+  const std::vector<std::string> rest = call->end();
+  ASSERT_GE(rest.size(), 6U);
+  EXPECT_EQ(rest.back(), "status 0");
+  size_t frames = 0;
+  for (const std::string& line : rest)
+    frames +=
+        line.find("\"ClientName\":\"stream\",\"ServiceName\":\"demo\"},\"payload\":{\"frames\":240}}}") !=
+        std::string::npos;
+  EXPECT_EQ(frames, 2U);
+
+  ASSERT_TRUE(arrive("client=call&method=11", 1)) << daemonLog();
+  ASSERT_TRUE(arrive("client=stream&method=12", 2)) << daemonLog();
+  const std::string callID = textOf(records("call", 11).at(0), "_sessionID");
+  for (const char* client : {"call", "stream"})
+    for (const Dictionary& record : records(client)) {
+      // The call's own start message is older than what the call shares.
+      const bool older = textOf(record, "_method") == "0" && textOf(record, "_status") == "0" &&
+                         std::string(client) == "call";
+      EXPECT_EQ(textOf(record, "callKind"), older ? "(null)" : "video") << client << description(record);
+      EXPECT_EQ(textOf(record, "_sessionID").substr(0, callID.size()), callID);
+    }
+  EXPECT_EQ(textOf(records("stream", 12).at(0), "_sessionID").size(), 2 * callID.size() + 1);
+}
+
+}  // namespace
+}  // namespace kyt
