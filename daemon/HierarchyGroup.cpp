@@ -7,6 +7,7 @@
 namespace kyt {
 
 uint64_t HierarchyGroup::append(Session session) {
+  runs_.reset();
   const uint64_t place = nextPlace_++;
   const uint32_t level = session->hierarchyLevel();
   byLevel_[{level, place}] = session.get();
@@ -17,6 +18,7 @@ uint64_t HierarchyGroup::append(Session session) {
 void HierarchyGroup::remove(uint64_t place) {
   const auto member = inOrder_.find(place);
   if (member == inOrder_.end()) return;
+  runs_.reset();
   byLevel_.erase({member->second.level, place});
   inOrder_.erase(member);
 }
@@ -24,6 +26,7 @@ void HierarchyGroup::remove(uint64_t place) {
 void HierarchyGroup::relevel(uint64_t place) {
   const auto member = inOrder_.find(place);
   if (member == inOrder_.end()) return;
+  runs_.reset();
   ReportingdSession* session = member->second.session.get();
   byLevel_.erase({member->second.level, place});
   member->second.level = session->hierarchyLevel();
@@ -43,6 +46,37 @@ HierarchyGroup::Session HierarchyGroup::firstAggregatorBelow(uint32_t level) con
     first = byLevel_.upper_bound({first->first.first, std::numeric_limits<uint64_t>::max()});
   }
   return nullptr;
+}
+
+HierarchyGroup::Runs HierarchyGroup::runs() const {
+  Runs runs;
+  Run* last = nullptr;
+  uint64_t next = 0;
+  for (const auto& [key, session] : byLevel_) {
+    const uint32_t level = key.first;
+    if (last == nullptr || level > next) {
+      last = &runs[level];
+      next = level;
+    } else if (level < next) {
+      continue;  // not the first of its level
+    }
+    if (!last->ends.empty()) last->identifiers += '.';
+    last->identifiers += session->sessionIDString().view();
+    last->ends.push_back(last->identifiers.size());
+    ++next;
+  }
+  return runs;
+}
+
+HierarchyGroup::Ancestors HierarchyGroup::ancestorsOf(uint32_t level) const {
+  if (level == 0) return {};
+  if (!runs_) runs_ = runs();
+  auto found = runs_->lower_bound(level);
+  if (found == runs_->begin()) return {};
+  const auto& [first, run] = *--found;
+  if (level - first > run.ends.size()) return {};
+  const std::string_view text = run.identifiers;
+  return {String(text.substr(0, run.ends[level - first - 1])), first == 0};
 }
 
 }  // namespace kyt

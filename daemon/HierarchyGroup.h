@@ -6,7 +6,12 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <optional>
+#include <string>
 #include <utility>
+#include <vector>
+
+#include "platform/Value.h"
 
 namespace kyt {
 
@@ -30,6 +35,14 @@ class HierarchyGroup {
   // Of the levels below `level`, lowest first, the first session that aggregates; only the first session of
   // each level counts.
   [[nodiscard]] Session firstAggregatorBelow(uint32_t level) const;
+  // The identifiers of the ancestors of a session at `level`, root first and joined by ".": those of the first
+  // sessions of the levels right above it, up to the first level that nobody holds. None when that is the
+  // next one above.
+  struct Ancestors {
+    std::optional<String> identifiers;
+    bool complete = false;  // up to level 0
+  };
+  [[nodiscard]] Ancestors ancestorsOf(uint32_t level) const;
   // (place, session), in order. The group must not change during an enumeration.
   struct Member {
     Session session;
@@ -39,9 +52,19 @@ class HierarchyGroup {
   [[nodiscard]] auto end() const { return inOrder_.end(); }
 
  private:
+  // Levels that follow one another without a gap. What stands above a level is the beginning of its run's
+  // text, so that thousands of levels beneath each other cost no more than they are long.
+  struct Run {
+    std::string identifiers;   // of all its levels
+    std::vector<size_t> ends;  // of each level's identifier
+  };
+  using Runs = std::map<uint32_t, Run>;  // by the first level
+  [[nodiscard]] Runs runs() const;
+
   uint64_t nextPlace_ = 1;
   std::map<uint64_t, Member> inOrder_;
   std::map<std::pair<uint32_t, uint64_t>, ReportingdSession*> byLevel_;  // (level, place)
+  mutable std::optional<Runs> runs_;                                     // until the group changes
 };
 
 }  // namespace kyt

@@ -78,7 +78,7 @@ std::optional<String> ReportingdAgent::parentSessionIDStringForSession(Reporting
   Log& log = configuration_.platform.log;
   MonitorLock lock(monitor_);
   const std::optional<String> token = session.hierarchyToken();
-  uint32_t level = session.hierarchyLevel();
+  const uint32_t level = session.hierarchyLevel();
   if (level == 0 || !token) return std::nullopt;
   log.debug("parentSessionIDStringForSession: Checking hierarchyToken '%s' for session %u", token->c_str(),
             session.sessionID());
@@ -93,20 +93,12 @@ std::optional<String> ReportingdAgent::parentSessionIDStringForSession(Reporting
                session.sessionID(), token->c_str());
     return std::nullopt;
   }
-  // Ends at the first level that nobody holds, so it never counts through a client's number.
-  std::optional<String> result;
-  while (level-- > 0) {
-    const std::shared_ptr<ReportingdSession> parent = sessions->getFirstSessionWithHierarchy(level);
-    if (parent == nullptr) {
-      log.normal(
-          "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%s'",
-          result ? result->c_str() : "(null)");
-      break;
-    }
-    result = result ? String(formatObjects("%@.%@", {parent->sessionIDString(), *result}))
-                    : parent->sessionIDString();
-  }
-  return result;
+  const HierarchyGroup::Ancestors ancestors = sessions->ancestorsOf(level);
+  if (!ancestors.complete)
+    log.normal(
+        "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%s'",
+        ancestors.identifiers ? ancestors.identifiers->c_str() : "(null)");
+  return ancestors.identifiers;
 }
 
 std::shared_ptr<ReportingdSession> ReportingdAgent::parentSessionForChild(ReportingdSession& session) {

@@ -202,5 +202,34 @@ TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
   EXPECT_TRUE(clientWith(sessionInfoAt(0, "E"), false, 1001).session->hierarchyToken()) << "another user's";
 }
 
+TEST_F(AgentHierarchy, ALevelThatComesOrGoesChangesWhatIsAboveTheOthers) {
+  const Client a = clientWith(sessionInfoAt(0)), c = clientWith(sessionInfoAt(2)),
+               d = clientWith(sessionInfoAt(3));
+  EXPECT_EQ(parentID(d), id(c));
+  Client b = clientWith(sessionInfoAt(1));
+  EXPECT_EQ(parentID(d), id(a) + "." + id(b) + "." + id(c));
+  const Client second = clientWith(sessionInfoAt(1));
+  EXPECT_EQ(parentID(d), id(a) + "." + id(b) + "." + id(c)) << "the first of a level counts";
+  b.connection->invalidateNow();
+  EXPECT_EQ(parentID(d), id(a) + "." + id(second) + "." + id(c));
+  Client moves = second;
+  identify(moves, sessionInfo());
+  EXPECT_EQ(parentID(c), std::nullopt) << "its level is 0 now";
+  EXPECT_EQ(parentID(d), id(c));
+}
+
+// A client may stack all its connections. What stands above each is copied from one text; joined anew level
+// by level this took the square of their number for each, for minutes, while every other session waited.
+TEST_F(AgentHierarchy, ThousandsOfLevelsBeneathEachOtherAreJoined) {
+  constexpr int kLevels = 3000;
+  std::vector<Client> clients;
+  for (int level = 0; level < kLevels; ++level) clients.push_back(clientWith(sessionInfoAt(level)));
+  std::string expected;
+  for (int level = 1; level < kLevels; ++level) {
+    expected += (level == 1 ? "" : ".") + id(clients[level - 1]);
+    ASSERT_EQ(parentID(clients[level]), expected) << level;
+  }
+}
+
 }  // namespace
 }  // namespace kyt
