@@ -16,8 +16,10 @@ constexpr Duration kPollPeriod =
     std::chrono::milliseconds(5);  // of what has no event of its own, at the end only
 constexpr Duration kCancelGrace = std::chrono::seconds(1);  // for what was cancelled to call its completions
 
-WorkerPoolOptions workerPoolOptions() {
+WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log) {
   WorkerPoolOptions options;
+  options.counters = &counters;
+  options.log = &log;
   options.maxWorkers = Limits::maxWorkers;
   options.nameThread = beginServiceThread;
   return options;
@@ -90,7 +92,7 @@ DaemonServices::DaemonServices(Start start)
       log_(start.log),
       idle_(std::move(start.idle)),
       reactor_(std::move(start.reactor)),
-      workers_(workerPoolOptions()),
+      workers_(workerPoolOptions(counters_, log_)),
       userDefaults_({start.paths.userDefaults()}, log_, counters_, clock_),
       deviceProperties_(deviceSources(start.paths), cryptography_, log_),
       consent_(userDefaults_),

@@ -14,6 +14,7 @@
 
 #include "platform/ConditionVariable.h"
 #include "platform/Counters.h"
+#include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "platform/SerialQueue.h"
 #include "platform/SpinPause.h"
@@ -62,7 +63,8 @@ class WorkerPool::Implementation {
   bool sleep(Worker& self) REQUIRES(mutex_);
   std::shared_ptr<SerialQueue> take(Worker& self) REQUIRES(mutex_);
   void release(Worker& self) REQUIRES(mutex_);
-  void countExhausted();
+  void countExhausted() REQUIRES(mutex_);
+  void tellExhausted();
   [[nodiscard]] bool ownerMayRun(uint64_t owner) REQUIRES(mutex_);
   [[nodiscard]] Worker* workerToWake() REQUIRES(mutex_);
   void start() REQUIRES(mutex_);
@@ -86,6 +88,7 @@ class WorkerPool::Implementation {
   uint64_t wakeUps_ GUARDED_BY(mutex_) = 0;
   size_t borrowed_ GUARDED_BY(mutex_) = 0;  // queues that threads of others run
   bool stopping_ GUARDED_BY(mutex_) = false;
+  bool mustTell_ GUARDED_BY(mutex_) = false;  // that work waited; told by the next worker, without the lock
 };
 
 void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
@@ -164,8 +167,10 @@ void WorkerPool::Implementation::work(Worker& self) {
     }
     --looking_;
     Worker* next = workerToWake();
+    const bool mustTell = std::exchange(mustTell_, false);
     mutex_.unlock();
     if (next != nullptr) next->wake.notifyOne();
+    if (mustTell) tellExhausted();
     self.queue = queue.get();
     queue->runPending();
     self.queue = nullptr;
@@ -230,7 +235,14 @@ void WorkerPool::Implementation::release(Worker& self) {
 }
 
 void WorkerPool::Implementation::countExhausted() {
-  if (options_.counters != nullptr) options_.counters->add(Reason::workersExhausted);
+  if (options_.counters == nullptr) return;
+  options_.counters->add(Reason::workersExhausted);
+  mustTell_ = options_.log != nullptr;
+}
+
+void WorkerPool::Implementation::tellExhausted() {
+  if (options_.counters->addAndMayLog(Reason::workersExhausted, std::chrono::steady_clock::now(), 0))
+    options_.log->normal("WorkerPool(work): work waits, as many workers as may be are in use");
 }
 
 void WorkerPool::Implementation::block() {

@@ -21,6 +21,7 @@
 namespace kyt {
 
 class Counters;
+class Log;
 
 struct WorkerPoolOptions {
   size_t runnable = 0;  // workers that may run without being blocked; 0: the number of processors, at least 2
@@ -29,6 +30,7 @@ struct WorkerPoolOptions {
   const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
   void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
   Counters* counters = nullptr;  // Reason::workersExhausted, each time a queue must wait for a limit
+  Log* log = nullptr;            // with `counters`: a line about that, at most once a minute
 };
 
 struct WorkerPoolFigures {

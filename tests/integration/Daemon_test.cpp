@@ -220,6 +220,22 @@ TEST_F(Daemon, SIGTERMCancelsADownload) {
       << daemon_.log();
 }
 
+// A download holds up every session that needs a storebag, so one user's sessions come to hold all workers that
+// one user may.
+TEST_F(Daemon, CountsAndSaysThatAUsersWorkWaitsForWorkers) {
+  TestHTTPServer::Reply never;
+  never.behaviour = TestHTTPServer::Behaviour::hold;
+  server_.setReply(never);
+  ASSERT_TRUE(daemon_.startAndWait());
+  std::vector<std::unique_ptr<KYTReporting>> clients;
+  for (int i = 0; i < 300; ++i) clients.push_back(open());
+  for (const auto& client : clients) client->startConfiguration();
+  EXPECT_TRUE(eventually([&] { return daemon_.logged("WorkerPool(work): work waits"); }));
+  daemon_.terminate();
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  EXPECT_TRUE(daemon_.logged("shutDown: workers-exhausted: "));
+}
+
 TEST_F(Daemon, ManyClientsOfOneStorebagFetchItOnce) {
   serve();
   ASSERT_TRUE(daemon_.startAndWait());

@@ -11,8 +11,10 @@
 #include <vector>
 
 #include "platform/Counters.h"
+#include "platform/Log.h"
 #include "platform/Semaphore.h"
 #include "platform/SerialQueue.h"
+#include "platform/fake/MemoryLogSink.h"
 #include "tests/support/Eventually.h"
 
 namespace kyt {
@@ -148,6 +150,33 @@ TEST(WorkerPool, NeverHasMoreThreadsThanItsMost) {
   for (int i = 0; i < 10; ++i) release.signal();
   EXPECT_TRUE(eventually([&] { return ran == 10; }));
   EXPECT_EQ(pool.figures().mostWorkers, 6u);
+}
+
+TEST(WorkerPool, SaysOnceAMinuteThatWorkWaits) {
+  Counters counters;
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::normal);
+  WorkerPoolOptions o = options(2, 2);
+  o.counters = &counters;
+  o.log = &log;
+  std::atomic<int> ran{0};
+  {
+    WorkerPool pool(o);
+    Semaphore release;
+    std::vector<std::shared_ptr<SerialQueue>> queues;
+    for (int i = 0; i < 10; ++i) {
+      queues.push_back(SerialQueue::create("blocked", pool));
+      queues.back()->async([&] {
+        release.wait();
+        ++ran;
+      });
+    }
+    EXPECT_TRUE(eventually([&] { return pool.figures().blocked == 2; }));
+    for (int i = 0; i < 10; ++i) release.signal();
+    EXPECT_TRUE(eventually([&] { return ran == 10; }));
+  }
+  EXPECT_GT(counters.value(Reason::workersExhausted), 1u);
+  EXPECT_EQ(sink.count(LogLevel::normal, "WorkerPool(work): work waits"), 1u);
 }
 
 TEST(WorkerPool, LetsOneOwnerHoldHalfOfItsWorkersAndOthersPass) {
