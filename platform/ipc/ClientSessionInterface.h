@@ -58,8 +58,9 @@ class ClientSessionInterface {
 class ClientSessionReplyInterface {
  public:
   virtual ~ClientSessionReplyInterface() = default;
-  // One way. An error means that the message could not be queued for the client (it is gone, or reads too
-  // slowly).
+  // One way. An error means that the message cannot reach the client (it is gone, or the message is too
+  // large). One that is dropped because the client reads too slowly is counted there, and is no error: there
+  // may be thousands a second, and each error is a log line.
   [[nodiscard]] virtual std::optional<Error> sendMessageToClient(std::optional<Dictionary> sessionInfo,
                                                                  double timestamp, uint16_t category,
                                                                  uint16_t type,

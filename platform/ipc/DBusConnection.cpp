@@ -72,8 +72,9 @@ void DBusConnection::setExportedObject(std::shared_ptr<ClientSessionInterface> o
 }
 
 void DBusConnection::invalidate() {
-  if (invalidating_.exchange(true)) return;
-  queue_->async([self = shared_from_this()] { self->end(false, false); });
+  hurried_ = true;
+  if (!invalidating_.exchange(true)) queue_->async([self = shared_from_this()] { self->end(false, false); });
+  scheduleTurn();  // closes a connection that has ended and only waits to be written
 }
 
 void DBusConnection::finish() {
@@ -91,6 +92,7 @@ void DBusConnection::abandon() {
   }
   watch.cancel();
   output_->close();
+  context_->remove(number_, user_);
 }
 
 // Reports the one problem that ends the connection.
@@ -250,7 +252,7 @@ std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionar
             "DBusConnection(sendMessageToClient): message dropped, connection %llu of user %u reads too slowly",
             static_cast<unsigned long long>(number_), user_);
       }
-      return Error{"KYTReportingErrorDomain", -1, "The client reads too slowly"};
+      return std::nullopt;
     case ConnectionOutput::Sent::refused:
       return Error{"KYTReportingErrorDomain", -1, "The message is too large"};
     case ConnectionOutput::Sent::closed:

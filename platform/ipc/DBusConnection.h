@@ -113,6 +113,7 @@ class DBusConnection final : public Connection,
   std::shared_ptr<ConnectionOutput> output_;
   std::atomic<bool> invalidating_{false};  // stop handling calls
   std::atomic<bool> finishing_{false};     // stop reading
+  std::atomic<bool> hurried_{false};       // do not wait for what is queued to be written
   std::atomic<bool> peerGone_{false};      // the reactor saw the end of the client's side
   std::atomic<bool> turnScheduled_{false};
 

@@ -35,7 +35,7 @@ void DBusConnection::turn() {
   if (closed()) return;
   if (ended_) {
     // Only what is queued still keeps the connection.
-    if (output_->finish() || peerGone_) closeStream();
+    if (output_->finish() || peerGone_ || hurried_) closeStream();
     return;
   }
   if (!started_) {
@@ -49,7 +49,7 @@ void DBusConnection::turn() {
     Progress progress;
     step = runSteps(progress);
     if (step == Step::broken || step == Step::ended) end(step == Step::broken, false);
-    if (step == Step::stopped) end(false, finishing_);
+    if (step == Step::stopped) end(false, finishing_ && !hurried_);
   }
   if (step == Step::more) scheduleTurn();
   if (step == Step::drained) armRead();

@@ -27,7 +27,9 @@ class CountingSession : public ClientSessionInterface {
   void fetchStatesWithUserInfo(std::optional<Dictionary>, StatesReply reply) override { reply(std::nullopt); }
   void fetchDisplayURL(StringReply reply) override {
     ++calls;
-    if (blocks) {
+    if (onDisplayURL) {
+      onDisplayURL(std::move(reply));
+    } else if (blocks) {
       reply("early");
       BlockingScope blocking;
       writesWhenBlocked = writes();
@@ -51,6 +53,7 @@ class CountingSession : public ClientSessionInterface {
   size_t writesWhenBlocked = 0;
   std::function<size_t()> writes;
   std::vector<StatesReply> held;
+  std::function<void(StringReply)> onDisplayURL;
 };
 
 class NoEntitlements final : public Entitlements {
@@ -341,6 +344,141 @@ TEST_F(DBusConnectionTest, TriesAgainToAcceptAfterAPauseWhenNoDescriptorsAreLeft
   timers_.advance(std::chrono::milliseconds(100));
   executor_.runAll();
   EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, AHandshakeThatBreaksOffLeavesNoTimer) {
+  say(std::string("\0AUTH", 5));
+  executor_.runAll();
+  EXPECT_EQ(timers_.pending(), 1u);
+  pipe_->ended = true;
+  ASSERT_TRUE(reactor_.report(kStream, ready::readable));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_EQ(timers_.pending(), 0u);
+}
+
+TEST_F(DBusConnectionTest, HandlesNoCallAfterItWasInvalidated) {
+  shakeHands();
+  session_->onDisplayURL = [this](StringReply reply) {
+    reply("url");
+    connection_->invalidate();
+  };
+  say(displayURLCalls(5));
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 1);
+  EXPECT_EQ(invalidations_, 1);
+}
+
+TEST_F(DBusConnectionTest, WhatATurnsDeferredWorkAnswersLeavesBeforeTheEnd) {
+  shakeHands();
+  const auto other = SerialQueue::create("test.other", executor_);
+  session_->onDisplayURL = [&](StringReply reply) {
+    other->async([reply = std::move(reply)]() mutable { reply("late"); });
+  };
+  pipe_->ended = true;
+  say(displayURLCalls(1));
+  executor_.runAll();
+  while (reactor_.report(kStream, ready::readable)) executor_.runAll();
+  EXPECT_TRUE(pipe_->closed);
+  EXPECT_NE(pipe_->fromServer.find("late"), std::string::npos);
+}
+
+TEST_F(DBusConnectionTest, AClientThatEndedItsSideIsReadToTheEndAlthoughItTakesNoReplies) {
+  shakeHands();
+  pipe_->room = 100;
+  constexpr int kCalls = 800;  // replies of more than the limit, and less than twice that
+  say(displayURLCalls(kCalls));
+  executor_.runAll();
+  EXPECT_LT(session_->calls, kCalls);
+  EXPECT_EQ(counters_.value(Reason::queuedBytesExceeded), 1u);
+  pipe_->ended = true;
+  ASSERT_TRUE(reactor_.report(kStream, ready::ended));
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, kCalls);
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_TRUE(pipe_->closed);
+  EXPECT_EQ(counters_.value(Reason::clientNotReading), 0u);
+}
+
+TEST_F(DBusConnectionTest, NothingIsKeptForAClientThatPassedTwiceTheLimit) {
+  shakeHands();
+  pipe_->room = 0;
+  std::string call;
+  MessageWriter writer(call);
+  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
+  ASSERT_TRUE(writer.end());
+  say(call);
+  executor_.runAll();
+  ASSERT_EQ(session_->held.size(), 1u);
+  session_->held[0](Array{std::string(50000, 'x')});
+  EXPECT_TRUE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 1, 2, std::nullopt))
+      << "before its queue has seen to the end";
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_TRUE(pipe_->closed);
+}
+
+// At the deadline of a shut-down.
+TEST_F(DBusConnectionTest, InvalidatingEndsTheWaitOfAFinishedConnectionToBeWritten) {
+  shakeHands();
+  pipe_->room = 10;
+  say(displayURLCalls(5));
+  executor_.runAll();
+  connection_->finish();
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_FALSE(pipe_->closed) << "it waits for room";
+  connection_->invalidate();
+  executor_.runAll();
+  EXPECT_TRUE(pipe_->closed);
+  EXPECT_EQ(server_->connectionCount(), 0u);
+  EXPECT_EQ(invalidations_, 1);
+}
+
+TEST_F(DBusConnectionTest, InvalidatingRightAfterFinishingWaitsForNothing) {
+  shakeHands();
+  pipe_->room = 10;
+  say(displayURLCalls(5));
+  executor_.runAll();
+  connection_->finish();
+  connection_->invalidate();
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_TRUE(pipe_->closed);
+}
+
+TEST(DBusServerInMemory, FreesConnectionsThatAreThereWhenItGoes) {
+  Limits limits;
+  Counters counters;
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::debug);
+  ManualClock clock;
+  ManualTimers timers(clock);
+  ManualExecutor executor;
+  ManualReactor reactor;
+  NoEntitlements entitlements;
+  struct Keeper final : ListenerDelegate {
+    bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& c) override {
+      c->setExportedObject(std::make_shared<CountingSession>());
+      c->resume();
+      connection = c;
+      return true;
+    }
+    std::weak_ptr<Connection> connection;
+  } keeper;
+  auto acceptor = std::make_unique<MemoryAcceptor>();
+  MemoryAcceptor* accepting = acceptor.get();
+  auto server = std::make_unique<DBusServer>(
+      DBusServerServices{limits, counters, log, clock, timers, executor, reactor, entitlements, "id"},
+      std::move(acceptor));
+  server->setDelegate(keeper);
+  server->resume();
+  accepting->waiting.push_back(std::make_unique<MemoryStream>(std::make_shared<MemoryPipe>(), kStream));
+  ASSERT_TRUE(reactor.report(MemoryAcceptor::kDescriptor, ready::readable));
+  executor.runAll();
+  ASSERT_FALSE(keeper.connection.expired());
+  server.reset();
+  EXPECT_TRUE(keeper.connection.expired());
 }
 
 }  // namespace
