@@ -131,5 +131,14 @@ TEST_F(AgentHealth, AnEmptyStorebagCacheHasTheSizeOfAnEmptyDictionary) {
   EXPECT_EQ(*payload.find("CalculatedMemoryUsage"), *payload.find("StorebagsSize"));
 }
 
+TEST_F(AgentHealth, MeasuresTheStorebagCacheAnewAfterEachFetch) {
+  Client a = clientWith(sessionInfo(7));
+  const uint64_t before = report(a).find("StorebagsSize")->unsignedLongLongValue();
+  configure(a);
+  const Dictionary payload = report(a);
+  EXPECT_EQ(*payload.find("StorebagsCount"), Value(1));
+  EXPECT_GT(payload.find("StorebagsSize")->unsignedLongLongValue(), before);
+}
+
 }  // namespace
 }  // namespace kyt

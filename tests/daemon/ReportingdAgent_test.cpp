@@ -110,5 +110,55 @@ TEST_F(AgentConnections, ShutDownRefusesNewConnectionsAndFinishesTheOthers) {
   EXPECT_FALSE(connect());
 }
 
+// Its entitlement is asked for while a shut-down begins, so its session misses the shut-down's look at the
+// list.
+class LateConnection final : public Connection, private ClientSessionReplyInterface {
+ public:
+  LateConnection(ReportingdAgent& agent, std::shared_ptr<SerialQueue> queue)
+      : agent_(agent), queue_(std::move(queue)) {}
+  bool finished = false;
+
+  Value entitlementValue(std::string_view) override {
+    agent_.finishAllSessions();
+    return true;
+  }
+  std::string description() const override { return "<late>"; }
+  uint32_t peerUser() const override { return 1000; }
+  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override {
+    object_ = std::move(object);
+  }
+  void setInterruptionHandler(Task handler) override { interruption_ = std::move(handler); }
+  void setInvalidationHandler(Task handler) override { invalidation_ = std::move(handler); }
+  void resume() override {}
+  void invalidate() override {
+    object_.reset();
+    interruption_.reset();
+    if (Task invalidation = std::move(invalidation_)) invalidation();
+  }
+  void finish() override { finished = true; }
+  ClientSessionReplyInterface& remoteObjectProxy() override { return *this; }
+  const std::shared_ptr<SerialQueue>& queue() const override { return queue_; }
+
+ private:
+  std::optional<Error> sendMessageToClient(std::optional<Dictionary>, double, uint16_t, uint16_t,
+                                           std::optional<Dictionary>) override {
+    return std::nullopt;
+  }
+  ReportingdAgent& agent_;
+  const std::shared_ptr<SerialQueue> queue_;
+  std::shared_ptr<ClientSessionInterface> object_;
+  Task interruption_, invalidation_;
+};
+
+TEST_F(AgentConnections, ASessionThatAppearsDuringAShutDownIsFinishedToo) {
+  const auto connection =
+      std::make_shared<LateConnection>(agent_, SerialQueue::create("test.connection", test_.executor));
+  EXPECT_TRUE(agent_.listenerShouldAcceptNewConnection(listener_, connection));
+  EXPECT_TRUE(connection->finished);
+  EXPECT_FALSE(agent_.waitUntilSessionsHaveEnded(Duration(0)));
+  connection->invalidate();
+  EXPECT_TRUE(agent_.waitUntilSessionsHaveEnded(Duration(0)));
+}
+
 }  // namespace
 }  // namespace kyt

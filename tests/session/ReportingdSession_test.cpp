@@ -348,5 +348,16 @@ TEST_F(ReportingdSessionEnd, AFlushAnswerAfterTheEndIsHarmless) {
   EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[httppost -> flushMessages] late"});
 }
 
+TEST_F(ReportingdSessionEnd, LetsGoOfWhatItHeldAlthoughSomebodyStillHoldsTheSession) {
+  configure(client_, {"httppost"}, sessionInfoAtLevel(1));
+  client_.session->dealloc();
+  EXPECT_EQ(test_.urlSessions.sessionsInvalidated(), 1U);
+  EXPECT_EQ(client_.session->connection(), nullptr);
+  EXPECT_FALSE(client_.session->hierarchyToken());
+  EXPECT_FALSE(client_.session->sessionInfo());
+  client_.session->sendToAggregator(std::nullopt, 1, 2, 3, std::nullopt);
+  EXPECT_TRUE(client_.connection->messagesToClient().empty()) << "nothing is sent after the end";
+}
+
 }  // namespace
 }  // namespace kyt

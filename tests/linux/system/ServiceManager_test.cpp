@@ -182,6 +182,17 @@ TEST_F(LinuxProcessTransactionTest, ABeginThatOvertakesTheTimersWorkWins) {
   EXPECT_EQ(asked_, 0);
 }
 
+TEST_F(LinuxProcessTransactionTest, ASessionThatCameAndWentBeforeTheTimersWorkRanCountsAnew) {
+  const auto transaction = make(true);
+  timers_.advance(std::chrono::seconds(30));  // due, handed to the queue, not run yet
+  transaction->begin();
+  transaction->end();
+  executor_.runAll();
+  EXPECT_EQ(asked_, 0);
+  advance(30);
+  EXPECT_EQ(asked_, 1);
+}
+
 TEST_F(LinuxProcessTransactionTest, WithoutSocketActivationNothingEnds) {
   const auto transaction = make(false);
   transaction->begin();
