@@ -33,8 +33,9 @@ namespace {
 
 constexpr uint64_t kStopEvent = ~uint64_t{0};
 constexpr uint64_t kTimerEvent = kStopEvent - 1;
-constexpr size_t kMostAside = 3;  // queues of one batch that the reactor's thread runs itself
+constexpr size_t kMostAside = 6;  // queues of one batch that the reactor's thread runs itself
 constexpr Duration kShort = std::chrono::microseconds(50);  // … if they usually take no longer; otherwise one
+constexpr Duration kLongRun = kShort * 4;  // one that was longer (a flush) says no more about the next ones
 constexpr Duration kLongest = std::chrono::hours(24 * 365 * 20);  // keeps sums of times in range
 
 uint32_t epollEvents(unsigned events) {
@@ -303,7 +304,7 @@ bool EpollReactor::Implementation::runAside(QueuesAside queues) {
   while (run.hasNext()) {
     if (!run.runNext()) return false;
     const MonotonicTime end = std::chrono::steady_clock::now();
-    usualRun_ += (end - begin - usualRun_) / 8;
+    usualRun_ += (std::min<Duration>(end - begin, kLongRun) - usualRun_) / 8;
     begin = end;
   }
   return true;
