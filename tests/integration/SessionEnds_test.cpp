@@ -4,15 +4,10 @@
 #include <fstream>
 
 #include "tests/integration/HierarchyFixture.h"
+#include "tests/support/Sanitizers.h"
 
 namespace kyt {
 namespace {
-
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool kSanitized = true;
-#else
-constexpr bool kSanitized = false;
-#endif
 
 class SessionEnds : public HierarchyTest {
  protected:

@@ -2,6 +2,7 @@
 // prints is read line by line, with a deadline. One thread.
 #pragma once
 
+#include <grp.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
@@ -21,8 +22,10 @@ namespace kyt {
 
 class ScriptedClient {
  public:
-  // `arguments` are further ones of "kytctl session", such as "--socket", PATH.
-  ScriptedClient(const std::string& kytctl, std::vector<std::string> arguments) {
+  // `arguments` are further ones of "kytctl session", such as "--socket", PATH. As another user only where
+  // this process may become that user.
+  ScriptedClient(const std::string& kytctl, std::vector<std::string> arguments,
+                 std::optional<uid_t> user = std::nullopt) {
     arguments.insert(arguments.begin(), {kytctl, "session", "-"});
     std::vector<char*> raw;
     for (std::string& argument : arguments) raw.push_back(argument.data());
@@ -31,6 +34,8 @@ class ScriptedClient {
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return;
     pid_ = ::fork();
     if (pid_ == 0) {
+      if (user && (::setgroups(0, nullptr) != 0 || ::setgid(*user) != 0 || ::setuid(*user) != 0))
+        ::_exit(126);
       for (int fd = 0; fd < 3; ++fd) ::dup2(ends[1], fd);
       ::execv(raw[0], raw.data());
       ::_exit(127);
