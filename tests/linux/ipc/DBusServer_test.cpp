@@ -8,6 +8,7 @@
 #include <thread>
 
 #include "ServerFixture.h"
+#include "platform/ipc/BodyReader.h"
 #include "tests/ipc/WireTestSupport.h"
 #include "tests/support/ChildProcess.h"
 
@@ -342,7 +343,13 @@ TEST(DBusServer, DropsMessagesToAClientThatReadsTooSlowlyAndKeepsIt) {
   for (int i = 0; i < sent - 1; ++i) ASSERT_TRUE(client.receive());
   EXPECT_FALSE(proxy.sendMessageToClient(std::nullopt, 7, 1, 2, payload));
   EXPECT_EQ(server.counted(Reason::aggregatorMessageDropped), 1u) << "there is room again";
-  EXPECT_TRUE(client.receive());
+  const auto next = client.receive();
+  ASSERT_TRUE(next);
+  BodyReader in(*next);
+  std::optional<Dictionary> info;
+  double timestamp = 0;
+  EXPECT_TRUE(in.readOptionalDictionary(info) && in.readDouble(timestamp));
+  EXPECT_EQ(timestamp, 7) << "nothing is left of the dropped one";
   EXPECT_EQ(server.invalidations, 0);
 }
 
