@@ -45,7 +45,8 @@ class TimerService {
   // Runs `work` once on `queue`, `delay` from now (a delay of zero or less: as soon as possible).
   virtual TimerHandle after(Duration delay, std::shared_ptr<SerialQueue> queue, Task work) = 0;
   // Runs `work` on `queue` first one period from now and then every period (at least 1 ms); up to `leeway` late, so
-  // that wake-ups can be shared. Ticks that were missed are not made up for.
+  // that wake-ups can be shared. Ticks that were missed, or that find the one before still waiting for the queue, are
+  // not made up for.
   virtual TimerHandle every(Duration period, Duration leeway, std::shared_ptr<SerialQueue> queue,
                             Task work) = 0;
 };

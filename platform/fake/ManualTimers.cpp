@@ -1,6 +1,7 @@
 #include "platform/fake/ManualTimers.h"
 
 #include <algorithm>
+#include <atomic>
 #include <map>
 #include <utility>
 
@@ -11,9 +12,11 @@ namespace kyt {
 namespace {
 
 // Periodic work is shared between the handle and what waits in the queue, and runs only while the handle
-// lives.
+// lives. A tick that finds the one before it still waiting is missed.
 struct Work {
+  explicit Work(Task what) : task(std::move(what)) {}
   Task task;
+  std::atomic<bool> waiting{false};
 };
 
 }  // namespace
@@ -72,7 +75,7 @@ TimerHandle ManualTimers::arm(Duration delay, Duration period, std::shared_ptr<S
     queues.push_back(queue);
     return {};
   }
-  auto shared = std::make_shared<Work>(Work{std::move(work)});
+  auto shared = std::make_shared<Work>(std::move(work));
   const MonotonicTime due = clock_.monotonic() + delay;
   MutexLock lock(shared_->mutex);
   const uint64_t id = shared_->next++;
@@ -105,7 +108,12 @@ void ManualTimers::advance(Duration duration, Task afterEach) {
     }
     const MonotonicTime now = clock_.monotonic();
     if (due > now) clock_.advance(due - now);
-    queue->async([work = std::move(work)] { work->task(); });
+    if (!work->waiting.exchange(true)) {
+      queue->async([work = std::move(work)] {
+        work->waiting = false;
+        work->task();
+      });
+    }
     afterEach();
   }
   const MonotonicTime now = clock_.monotonic();

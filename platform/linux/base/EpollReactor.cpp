@@ -136,18 +136,29 @@ class EpollReactor::Timer final : public TimerHandle::State, public std::enable_
         period_(period),
         leeway_(leeway),
         queue_(std::move(queue)),
-        work_(std::make_shared<Task>(std::move(work))) {}
+        work_(std::make_shared<Work>(std::move(work))) {}
   void cancel() override;
 
  private:
   friend class Implementation;
+  // A tick that finds the one before it still waiting for its queue is missed: a queue that is held up is not
+  // buried in ticks.
+  struct Work {
+    explicit Work(Task what) : task(std::move(what)) {}
+    void run() {
+      waiting = false;
+      task();
+    }
+    Task task;
+    std::atomic<bool> waiting{false};
+  };
   const std::shared_ptr<Implementation> reactor_;
   const Duration period_;  // zero: once
   const Duration leeway_;
   // Guarded by the reactor's mutex. What runs once is given away when it is due, so that a handle that lives
   // on keeps nothing alive.
   std::shared_ptr<SerialQueue> queue_;
-  std::shared_ptr<Task> work_;
+  std::shared_ptr<Work> work_;
   MonotonicTime due_;
   uint64_t id_ = 0;
   bool armed_ = false;
@@ -240,7 +251,7 @@ void EpollReactor::Implementation::stop() {
   stopping_ = true;
   signalEventDescriptor(stopEvent_.get());
   threads_.stop();
-  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Task>>>
+  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Timer::Work>>>
       works;  // destroyed without the lock
   std::map<TimerKey, std::shared_ptr<Timer>> dropped;
   MutexLock lock(mutex_);
@@ -429,7 +440,7 @@ void EpollReactor::Implementation::setAlarm() {
 }
 
 void EpollReactor::Implementation::fireTimers() {
-  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Task>>> due;
+  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Timer::Work>>> due;
   std::vector<std::shared_ptr<Timer>> timers;  // destroyed without the lock
   {
     MutexLock lock(mutex_);
@@ -441,14 +452,14 @@ void EpollReactor::Implementation::fireTimers() {
         due.emplace_back(std::move(timer->queue_), std::move(timer->work_));
         continue;
       }
-      due.emplace_back(timer->queue_, timer->work_);
+      if (!timer->work_->waiting.exchange(true)) due.emplace_back(timer->queue_, timer->work_);
       timer->due_ += timer->period_ * ((now - timer->due_) / timer->period_ + 1);
       insert(timer);
     }
     if (alarmAt_ <= now) alarmAt_ = {};  // it has gone off
     setAlarm();
   }
-  for (auto& [queue, work] : due) queue->async([work = std::move(work)] { (*work)(); });
+  for (auto& [queue, work] : due) queue->async([work = std::move(work)] { work->run(); });
 }
 
 std::unique_ptr<EpollReactor> EpollReactor::create(const char* threadName) {
