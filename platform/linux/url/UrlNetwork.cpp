@@ -1,6 +1,5 @@
 #include "platform/linux/url/UrlNetwork.h"
 
-#include <pthread.h>
 #include <strings.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -8,10 +7,10 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <csignal>
 #include <system_error>
 
 #include "platform/linux/base/CodePages.h"
+#include "platform/linux/base/Threads.h"
 
 namespace kyt {
 namespace {
@@ -22,10 +21,6 @@ constexpr Duration kStopPatience = std::chrono::seconds(5);
 
 MonotonicTime currentTime() {
   return std::chrono::steady_clock::now();
-}
-
-void nameThread(const char* name) {
-  pthread_setname_np(pthread_self(), name);
 }
 
 // libcurl takes an address without a scheme, or with a single slash behind it, for one over plain http: what
@@ -39,7 +34,7 @@ WorkerPoolOptions completionWorkers() {
   options.runnable = 2;
   options.maxWorkers = 4;
   options.name = "kyt-url";
-  options.nameThread = nameThread;
+  options.nameThread = beginServiceThread;
   return options;
 }
 
@@ -98,16 +93,11 @@ bool URLNetwork::startThread() {
   if (epoll_ < 0) epoll_ = epoll_create1(EPOLL_CLOEXEC);
   if (wake_ < 0) wake_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   if (epoll_ < 0 || wake_ < 0) return false;
-  // The thread takes no signals: they are the main thread's business.
-  sigset_t all, before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);
   try {
     thread_ = std::thread([this] { run(); });
     running_ = true;
   } catch (const std::system_error&) {  // too many threads: the next command tries again
   }
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
   return running_;
 }
 
@@ -147,7 +137,7 @@ URLFigures URLNetwork::figures() const {
 }
 
 void URLNetwork::run() {
-  nameThread("kyt-network");
+  beginServiceThread("kyt-network");
   workers_ = std::make_unique<WorkerPool>(completionWorkers());
   epoll_event wake{};
   wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read

@@ -1,5 +1,8 @@
 #include <curl/curl.h>
 
+#include <csignal>
+#include <filesystem>
+#include <fstream>
 #include <set>
 
 #include "platform/Limits.h"
@@ -194,6 +197,34 @@ TEST_F(CurlURLSession, RunsCompletionsOnWorkersOfItsOwnOneAfterTheOther) {
   EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
   EXPECT_EQ(most, 1);
   EXPECT_EQ(done, 50);
+}
+
+// The signals that a thread of this process blocks, by its name; nothing when there is no such thread.
+std::optional<uint64_t> signalsBlockedBy(const std::string& threadName) {
+  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+    std::ifstream status(task.path() / "status");
+    std::string name, blocked;
+    for (std::string line; std::getline(status, line);) {
+      if (line.starts_with("Name:\t")) name = line.substr(6);
+      if (line.starts_with("SigBlk:\t")) blocked = line.substr(8);
+    }
+    if (name == threadName) return std::stoull(blocked, nullptr, 16);
+  }
+  return std::nullopt;
+}
+
+TEST_F(CurlURLSession, ItsThreadsLeaveSignalsToTheOthersButForFaults) {
+  auto urls = session();
+  const Outcome outcome = perform(*urls, get(server_.url("/")));
+  for (const std::string& name : {std::string("kyt-network"), outcome.threadName()}) {
+    SCOPED_TRACE(name);
+    const std::optional<uint64_t> blocked = signalsBlockedBy(name);
+    ASSERT_TRUE(blocked);
+    for (const int signal : {SIGTERM, SIGINT, SIGHUP, SIGUSR1, SIGCHLD, SIGPIPE})
+      EXPECT_NE(*blocked & (uint64_t{1} << (signal - 1)), 0u) << signal;
+    for (const int fault : {SIGSEGV, SIGBUS, SIGABRT})
+      EXPECT_EQ(*blocked & (uint64_t{1} << (fault - 1)), 0u) << fault;
+  }
 }
 
 TEST_F(CurlURLSession, TakesRequestsFromManyThreads) {
