@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <set>
+#include <sstream>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 
@@ -136,26 +137,26 @@ TEST_F(CurlURLSessionTLS, RefusesARedirectThatLeavesHTTPS) {
   EXPECT_EQ(plain.requestCount(), 0u);
 }
 
-// nginx as a child process that ends with this object.
+// nginx as a child process that ends with this object. Its listening socket is made here and handed over, so
+// that no port is guessed. It answers for a second server of its own, through a socket in the folder, since a
+// proxy reads a request's body before it passes it on: nginx answers by itself before it has read the body,
+// which ends the stream under the client that still sends.
 class Nginx {
  public:
-  Nginx(const std::string& folder, const TestCertificate& certificate) : port_(freePort()) {
+  Nginx(const std::string& folder, const TestCertificate& certificate) {
     std::ofstream(folder + "/server.pem") << certificate.certificatePEM << certificate.keyPEM;
-    const std::string file = folder + "/nginx.conf", pem = folder + "/server.pem;\n";
-    std::ofstream(file)
-        << "user root;\ndaemon off;\nmaster_process off;\npid " << folder << "/pid;\nerror_log " << folder
-        << "/error.log;\nevents {}\nhttp {\naccess_log off;\nclient_body_temp_path " << folder
-        << "/body;\nproxy_temp_path " << folder << "/p;\nfastcgi_temp_path " << folder
-        << "/f;\nuwsgi_temp_path " << folder << "/u;\nscgi_temp_path " << folder
-        << "/s;\nserver {\nlisten 127.0.0.1:" << port_ << " ssl http2;\nssl_certificate " << pem
-        << "ssl_certificate_key " << pem
-        << "location / { add_header Last-Modified then always; "
-           "return 200 \"$server_protocol $connection $http_x_kyt_source_application\"; }\n}\n}\n";
+    const int listening = listenOnAFreePort();
+    const std::string file = folder + "/nginx.conf";
+    std::ofstream(file) << configuration(folder);
+    const std::string inherited = std::to_string(listening) + ";", errors = folder + "/error.log";
     pid_ = fork();
     if (pid_ == 0) {
-      execl("/usr/sbin/nginx", "nginx", "-c", file.c_str(), "-p", folder.c_str(), nullptr);
+      setenv("NGINX", inherited.c_str(), 1);
+      execl("/usr/sbin/nginx", "nginx", "-c", file.c_str(), "-p", folder.c_str(), "-e", errors.c_str(),
+            nullptr);
       _exit(127);
     }
+    close(listening);
   }
   ~Nginx() {
     kill(pid_, SIGTERM);
@@ -165,39 +166,46 @@ class Nginx {
   Nginx& operator=(const Nginx&) = delete;
 
   [[nodiscard]] std::string url() const { return "https://127.0.0.1:" + std::to_string(port_) + "/"; }
-  [[nodiscard]] bool listens() const {
-    sockaddr_in address = loopback(port_);
-    const int probe = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    const bool connected = connect(probe, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    close(probe);
-    return connected;
-  }
 
  private:
-  static sockaddr_in loopback(uint16_t port) {
+  [[nodiscard]] std::string configuration(const std::string& folder) const {
+    // With a socket handed over nginx needs its master process; its worker would leave root otherwise.
+    std::ostringstream text;
+    text << (geteuid() == 0 ? "user root;\n" : "") << "daemon off;\nworker_processes 1;\npid " << folder
+         << "/pid;\nerror_log " << folder << "/error.log;\nevents {}\nhttp {\naccess_log off;\n";
+    for (const char* kind : {"client_body", "proxy", "fastcgi", "uwsgi", "scgi"})
+      text << kind << "_temp_path " << folder << "/" << kind << ";\n";
+    text
+        << "server {\nlisten 127.0.0.1:" << port_ << " ssl http2;\nssl_certificate " << folder
+        << "/server.pem;\nssl_certificate_key " << folder
+        << "/server.pem;\nlocation / {\nproxy_pass http://unix:" << folder
+        << "/socket;\nproxy_pass_request_body off;\nproxy_set_header Content-Length \"\";\n"
+           "proxy_set_header X-Protocol $server_protocol;\nproxy_set_header X-Connection $connection;\n}\n}\n"
+           "server {\nlisten unix:"
+        << folder
+        << "/socket;\nlocation / { add_header Last-Modified then always; "
+           "return 200 \"$http_x_protocol $http_x_connection $http_x_kyt_source_application\"; }\n}\n}\n";
+    return text.str();
+  }
+  int listenOnAFreePort() {
     sockaddr_in address{};
     address.sin_family = AF_INET;
-    address.sin_port = htons(port);
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    return address;
-  }
-  static uint16_t freePort() {
-    sockaddr_in address = loopback(0);
     socklen_t size = sizeof address;
-    const int probe = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    (void)bind(probe, reinterpret_cast<sockaddr*>(&address), size);
-    (void)getsockname(probe, reinterpret_cast<sockaddr*>(&address), &size);
-    close(probe);
-    return ntohs(address.sin_port);
+    const int made = socket(AF_INET, SOCK_STREAM, 0);
+    EXPECT_EQ(bind(made, reinterpret_cast<sockaddr*>(&address), size), 0);
+    EXPECT_EQ(listen(made, 64), 0);
+    EXPECT_EQ(getsockname(made, reinterpret_cast<sockaddr*>(&address), &size), 0);
+    port_ = ntohs(address.sin_port);
+    return made;
   }
-  uint16_t port_;
+  uint16_t port_ = 0;
   pid_t pid_ = -1;
 };
 
 TEST_F(CurlURLSessionTLS, SpeaksHTTP2WithARealServerAndSharesOneConnectionInABurst) {
   if (access("/usr/sbin/nginx", X_OK) != 0) GTEST_SKIP() << "nginx is not installed";
   const Nginx nginx(authority_.folder(), authority_.issue());
-  ASSERT_TRUE(eventually([&] { return nginx.listens(); }));
   auto urls = session();
   std::vector<Outcome> outcomes(30);
   for (Outcome& outcome : outcomes)
