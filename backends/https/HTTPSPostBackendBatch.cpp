@@ -105,6 +105,10 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
   const uint64_t bytes = heldBytes(record);
   if (batched + bytes > platform_.limits.maxBatchBytes) {
     countDroppedByLimit();
+    // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
+    stateQueue().async([this] {
+      if (batchedEvents_ && batchedEvents_->empty()) batchedEvents_.reset();
+    });
     return flushed;
   }
   stateQueue().async([this, record = std::move(record), method, count, bytes]() mutable {

@@ -191,6 +191,17 @@ TEST_F(HTTPSPostBackendBatch, ReachingTheThresholdInStatesZeroAndThreeDiscardsTh
   }
 }
 
+TEST_F(HTTPSPostBackendBatch, AnEventDroppedFromAnEmptyBatchLeavesNothingToFlush) {
+  platform_.limits.maxBatchBytes = 20000;
+  inState(kBackendStateEnabled);
+  send(5, {{"k", std::string(30000, 'x')}});
+  EXPECT_EQ(dropped(Reason::batchFull), 1u);
+  EXPECT_EQ(flush().error->localizedDescription, "Nothing to flush");
+  send(5);
+  send(5, {{"k", std::string(30000, 'x')}});
+  EXPECT_EQ(postedRecords(), 1u);  // what was there before stays
+}
+
 TEST_F(HTTPSPostBackendBatch, AForcedFlushThatKeepsTheBatchStillAppends) {
   entry_.set("event_threshold", 0);
   inState(kBackendStateEnabled);
