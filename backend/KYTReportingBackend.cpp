@@ -152,11 +152,12 @@ String KYTReportingBackend::getPersistentIdentifierForDNU(bool respectDnu) {
   return persistentIdentifier(respectDnu ? "uuidRespectDnu" : "uuidOverrideDnu");
 }
 
-String KYTReportingBackend::persistentIdentifier(std::string_view key) {
+String KYTReportingBackend::persistentIdentifier(std::string_view key, const String* made) {
   const Value stored = platform_.userDefaults.value(kKYTReportingDefaultsDomain, key);
   if (const String* identifier = stored.string()) return *identifier;
-  return platform_.userDefaults.stringOrStore(kKYTReportingDefaultsDomain, key,
-                                              String(uuidText(platform_.random.uuidBytes())));
+  return platform_.userDefaults.stringOrStore(
+      kKYTReportingDefaultsDomain, key,
+      made != nullptr ? *made : String(uuidText(platform_.random.uuidBytes())));
 }
 
 }  // namespace kyt

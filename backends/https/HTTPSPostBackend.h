@@ -157,6 +157,8 @@ class HTTPSPostBackend : public KYTReportingBackend {
   int32_t extrasOnInternal_ = 0;
   Value overrideSampling_;  // a number, or null
   std::optional<String> uuidCustom_;
+  // The custom identifiers of this object's life by their keys: one that cannot be stored must not change.
+  std::vector<std::pair<std::string, String>> madeIdentifiers_;
   bool immutable_ = false;        // once set, the state is no longer decided anew
   size_t jsonSizeHint_ = 0;       // size of the last message
   mutable String reportVersion_;  // as records show it

@@ -14,6 +14,9 @@ namespace kyt {
 
 namespace {
 
+// Clients change their name and service rarely, if ever.
+constexpr size_t kMostMadeIdentifiers = 16;
+
 const String* textEntry(const Dictionary& dictionary, const char* key) {
   const Value* value = dictionary.find(key);
   return value != nullptr ? value->string() : nullptr;
@@ -272,7 +275,13 @@ String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Cl
   const std::string key =
       formatObjects("%@:%@:%@", {Value("uuid"), Value(client.name != nullptr ? *client.name : empty),
                                  Value(client.service != nullptr ? *client.service : empty)});
-  String identifier = persistentIdentifier(key);
+  const auto known = std::find_if(madeIdentifiers_.begin(), madeIdentifiers_.end(),
+                                  [&](const auto& made) { return made.first == key; });
+  String identifier = persistentIdentifier(key, known != madeIdentifiers_.end() ? &known->second : nullptr);
+  if (known == madeIdentifiers_.end()) {
+    if (madeIdentifiers_.size() >= kMostMadeIdentifiers) madeIdentifiers_.erase(madeIdentifiers_.begin());
+    madeIdentifiers_.emplace_back(key, identifier);
+  }
   platform_.log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
                        identifier.c_str());
   return identifier;

@@ -364,6 +364,33 @@ TEST_F(HTTPSPostBackendState, TheCustomIdentifierIsMadeOnceForClientAndService) 
   EXPECT_EQ(platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"), stored);
 }
 
+TEST_F(HTTPSPostBackendState, ACustomIdentifierThatCannotBeStoredStaysTheSameForClientAndService) {
+  platform_.userDefaults.setFailsWrites(true);
+  entry_ = {{"custom_clientId", true},
+            {"locale_whitelist", Array{"US"}},
+            {"filters", Array{}},
+            {"sampling_threshold", 1.0}};
+  const auto identifierOf = [&](const char* client) {
+    const std::string begin =
+        std::string("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:") + client + ":b: ";
+    backend().setUserInfoDict(
+        Dictionary{{kKYTReportingUserInfoClientName, client}, {kKYTReportingUserInfoServiceName, "b"}});
+    backend().updateState();
+    std::string last;
+    for (const auto& line : platform_.sink.lines())
+      if (line.line.starts_with(begin)) last = line.line.substr(begin.size());
+    return last;
+  };
+  const std::string first = identifierOf("a"), other = identifierOf("z");
+  EXPECT_EQ(first.size(), 36u);
+  EXPECT_NE(other, first);
+  EXPECT_EQ(identifierOf("a"), first);
+  EXPECT_EQ(identifierOf("z"), other);
+  platform_.userDefaults.setFailsWrites(false);
+  EXPECT_EQ(identifierOf("a"), first);
+  EXPECT_EQ(platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"), Value(first));
+}
+
 TEST_F(HTTPSPostBackendState, TheCustomIdentifierOfANamelessClientHasEmptyNames) {
   entry_ = {{"custom_clientId", true},
             {"locale_whitelist", Array{"US"}},
