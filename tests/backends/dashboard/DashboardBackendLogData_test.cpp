@@ -48,6 +48,7 @@ class RecordingDashboard final : public DashboardBackend {
       : DashboardBackend(platform, "dashboard", profile, std::nullopt, std::move(socket)) {
     postURL_ = "https://logs.example.org";
   }
+  using DashboardBackend::sendMessage;
   Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override {
     messages.push_back(message);
