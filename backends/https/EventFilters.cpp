@@ -8,8 +8,15 @@ namespace kyt {
 
 namespace {
 
-uint64_t lengthBit(size_t length) {
-  return uint64_t{1} << std::min<size_t>(length, 63);
+// One bit of 64 for the length and both ends of a key, the same for keys that differ in case alone. Most keys
+// of a record are about no filter, and this is what they cost.
+uint64_t shapeBit(std::string_view key) {
+  if (key.empty()) return 1;
+  const auto folded = [](char c) {
+    const auto byte = static_cast<unsigned char>(c);
+    return byte < 0x80 ? size_t{byte} | 0x20u : size_t{0x80};  // no fold makes a character ASCII
+  };
+  return uint64_t{1} << ((key.size() * 7 + folded(key.front()) + folded(key.back()) * 5) & 63);
 }
 
 template <typename Matches>
@@ -67,7 +74,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   if (filters.empty()) return;
   filters_.clear();
   filters_.reserve(filters.size());
-  keyLengths_ = 0;
+  keyShapes_ = 0;
   for (const Value& element : filters) {
     Filter filter;
     if (const Dictionary* dictionary = element.dictionary()) {
@@ -76,7 +83,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
       const Value* key = dictionary->find("key");
       if (key != nullptr && key->string() != nullptr) {
         filter.foldedKey = foldCase(*key->string());
-        keyLengths_ |= lengthBit(filter.foldedKey->size());
+        keyShapes_ |= shapeBit(*filter.foldedKey);
       }
       const Value* action = dictionary->find("action");
       const String* name = action != nullptr ? action->string() : nullptr;
@@ -88,7 +95,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
 }
 
 EventFilters::Action EventFilters::actionForKey(std::string_view key, int32_t method, int32_t status) const {
-  if ((keyLengths_ & lengthBit(key.size())) == 0) return Action::keep;
+  if ((keyShapes_ & shapeBit(key)) == 0) return Action::keep;
   for (const Filter& filter : filters_) {
     if (!filter.foldedKey || filter.foldedKey->size() != key.size()) continue;
     if (filter.method >= 0 && filter.method != method) continue;

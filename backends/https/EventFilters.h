@@ -46,7 +46,7 @@ class EventFilters {
   [[nodiscard]] Action actionForKey(std::string_view key, int32_t method, int32_t status) const;
 
   std::vector<Filter> filters_;
-  uint64_t keyLengths_ = 0;  // bit n (63: and more): some filter's key has n bytes
+  uint64_t keyShapes_ = 0;  // the bits that the filters' keys have (EventFilters.cpp)
 };
 
 }  // namespace kyt
