@@ -1,5 +1,6 @@
 #include "backends/dashboard/DashboardDatagram.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 
@@ -28,10 +29,10 @@ void DashboardDatagram::fill(const Header& header) {
 }
 
 void DashboardDatagram::appendPair(const char* key, const char* value) {
-  // Written behind the text so far rather than from a copy of it; cut like the whole.
-  const size_t room = kTextSize - textLength_;
-  std::snprintf(text() + textLength_, room, " %s=%s", key, value);
-  textLength_ += strnlen(text() + textLength_, room - 1);
+  char soFar[kTextSize];
+  std::memcpy(soFar, text(), textLength_ + 1);
+  const int whole = std::snprintf(text(), kTextSize, "%s %s=%s", soFar, key, value);
+  textLength_ = std::min(static_cast<size_t>(std::max(whole, 0)), kTextSize - 1);
 }
 
 void DashboardDatagram::finish() {

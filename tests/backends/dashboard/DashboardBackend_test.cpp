@@ -10,6 +10,14 @@ namespace {
 bool failNextAllocation = false;
 }
 
+// The thread sanitizer has an operator of its own that cannot be replaced.
+#if defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define KYT_FIXED_OPERATOR_NEW
+#endif
+#endif
+
+#ifndef KYT_FIXED_OPERATOR_NEW
 // Only what may fail allocates without throwing.
 void* operator new(size_t size, const std::nothrow_t&) noexcept {
   if (std::exchange(failNextAllocation, false)) return nullptr;
@@ -19,6 +27,7 @@ void* operator new(size_t size, const std::nothrow_t&) noexcept {
     return nullptr;
   }
 }
+#endif
 
 namespace kyt {
 namespace {
@@ -317,6 +326,9 @@ TEST_F(Dashboard, TheLongestLineIsWhole) {
 }
 
 TEST_F(Dashboard, WithoutMemorySendsNothing) {
+#ifdef KYT_FIXED_OPERATOR_NEW
+  GTEST_SKIP() << "no allocation can be made to fail under this sanitizer";
+#endif
   ASSERT_NE(make(profile()), nullptr);
   failNextAllocation = true;
   EXPECT_EQ(send(1), "null");
