@@ -12,6 +12,7 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/StopSignals.h"
 #include "platform/linux/base/UnixSocket.h"
+#include "platform/linux/system/DeletionBroker.h"
 #include "platform/linux/system/Files.h"
 #include "platform/linux/system/LandlockConfinement.h"
 #include "platform/linux/system/LogSinks.h"
@@ -67,8 +68,20 @@ std::unique_ptr<ProgramInspector> programInspector(Log& log) {
   return std::move(std::get<std::unique_ptr<ProgramInspectorProcess>>(started));
 }
 
+// Files that were uploaded are removed by a process outside the confinement, which alone may take its clients'
+// users; without it they stay.
+std::unique_ptr<DeletionBroker> deletionBroker(Log& log) {
+  auto started = DeletionBroker::start();
+  DeletionBroker::giveUpTakingUsers();
+  if (const auto* error = std::get_if<std::string>(&started)) {
+    log.error("main: Cannot remove files that were uploaded: %s", error->c_str());
+    return nullptr;
+  }
+  return std::move(std::get<std::unique_ptr<DeletionBroker>>(started));
+}
+
 int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspector& inspector,
-          StopSignals& stopSignals) {
+          const DeletionBroker* broker, StopSignals& stopSignals) {
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -81,7 +94,7 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
     log.error("main: Cannot start the reactor");
     return kCouldNotStart;
   }
-  DaemonServices services({settings, paths, log, inspector, std::move(reactor), std::move(acceptor),
+  DaemonServices services({settings, paths, log, inspector, broker, std::move(reactor), std::move(acceptor),
                            activated, [&stopSignals] { stopSignals.request(); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
@@ -122,12 +135,13 @@ int runDaemon(const DaemonOptions& options) {
   log.debug("main: At most %llu descriptors", static_cast<unsigned long long>(raiseDescriptorLimit()));
   StopSignals stopSignals;
   log.normal("startLogging: Daemon starts logging...");
+  const std::unique_ptr<DeletionBroker> broker = deletionBroker(log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   if (const auto error = confinement(paths, settings).enter(kServiceName)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
   }
-  return serve(settings, paths, log, *inspector, stopSignals);
+  return serve(settings, paths, log, *inspector, broker.get(), stopSignals);
 }
 
 }  // namespace kyt

@@ -31,7 +31,11 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/LinuxUDPSocket.h"
+#include "platform/linux/system/DeletionBroker.h"
+#include "platform/linux/system/DlopenPluginBundles.h"
+#include "platform/linux/system/JournalPowerLog.h"
 #include "platform/linux/system/LinuxDeviceProperties.h"
+#include "platform/linux/system/LinuxFileExtensions.h"
 #include "platform/linux/system/LinuxFileManager.h"
 #include "platform/linux/system/ProgramInspector.h"
 #include "platform/linux/system/ServiceManager.h"
@@ -51,6 +55,7 @@ class DaemonServices {
     const Paths& paths;
     Log& log;
     ProgramInspector& inspector;
+    const DeletionBroker* broker;  // null: uploaded files stay
     std::unique_ptr<EpollReactor> reactor;
     std::unique_ptr<StreamAcceptor> acceptor;
     bool socketActivated = false;
@@ -96,6 +101,9 @@ class DaemonServices {
   TomlEntitlements entitlements_;
   CurlURLSessionFactory urlSessions_;
   LinuxUDPSocketFactory udpSockets_;
+  LinuxFileExtensions fileExtensions_;
+  DlopenPluginBundles pluginBundles_;
+  JournalPowerLog powerLog_;
   Platform platform_;
 
   DeviceIdentity deviceIdentity_;

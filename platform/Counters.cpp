@@ -64,6 +64,10 @@ const char* reasonName(Reason reason) {
       return "message-log-line-lost";
     case Reason::valueNotPostable:
       return "value-not-postable";
+    case Reason::fileNotRemoved:
+      return "file-not-removed";
+    case Reason::powerLogUnavailable:
+      return "power-log-unavailable";
     case Reason::numberOfReasons:
       break;
   }

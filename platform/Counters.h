@@ -41,8 +41,10 @@ enum class Reason : uint8_t {
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
-  messageLogLineLost,  // no file could be made or written, or it is full
-  valueNotPostable,    // a record's value removed because JSON cannot carry it
+  messageLogLineLost,   // no file could be made or written, or it is full
+  valueNotPostable,     // a record's value removed because JSON cannot carry it
+  fileNotRemoved,       // an uploaded file that the broker could not or would not remove
+  powerLogUnavailable,  // a power-log event without a journal to take it
   numberOfReasons
 };
 

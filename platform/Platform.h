@@ -12,9 +12,12 @@ class Deflate;
 class DeviceProperties;
 class DiagnosticsConsent;
 class Executor;
+class FileExtensions;
 class JSON;
 class Log;
 class MemoryInfo;
+class PluginBundles;
+class PowerLog;
 class PropertyLists;
 class RandomSource;
 class Reactor;
@@ -45,6 +48,9 @@ struct Platform {
   UDPSocketFactory& udpSockets;
   Bundle& clientBundle;  // KYTReporting.bundle: version, publicKey.der
   Bundle& daemonBundle;  // kytreportingd.bundle: version
+  FileExtensions& fileExtensions;
+  PluginBundles& pluginBundles;
+  PowerLog& powerLog;
 };
 
 }  // namespace kyt

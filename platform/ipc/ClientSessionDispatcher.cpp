@@ -98,12 +98,16 @@ void finishSessionGracefully(const Message& message, const Peer& peer, BodyReade
 }
 
 // None when the indexes name no two descriptors of the message.
-bool takeExtension(const std::vector<uint32_t>& indexes, std::span<Descriptor> descriptors,
+bool takeExtension(const std::vector<uint32_t>& indexes, const Peer& peer,
                    std::optional<FileExtension>& extension) {
+  const std::span<Descriptor> descriptors = peer.descriptors;
   if (indexes.empty()) return true;
   if (indexes.size() != 2 || indexes[0] == indexes[1]) return false;
   if (indexes[0] >= descriptors.size() || indexes[1] >= descriptors.size()) return false;
-  extension = FileExtension{std::move(descriptors[indexes[0]]), std::move(descriptors[indexes[1]])};
+  PeerCredentials client = peer.stream.peer();
+  extension = FileExtension{std::move(descriptors[indexes[0]]),
+                            std::move(descriptors[indexes[1]]),
+                            {client.uid, client.gid, std::move(client.groups)}};
   return true;
 }
 
@@ -115,7 +119,7 @@ void uploadFile(const Message& message, const Peer& peer, BodyReader& in) {
   in.readDescriptorIndexes(indexes);
   if (in.finish() != BodyStatus::ok) return;
   std::optional<FileExtension> extension;
-  if (!takeExtension(indexes, peer.descriptors, extension)) {
+  if (!takeExtension(indexes, peer, extension)) {
     in.refuse("the extension is not two descriptors of the message");
     return;
   }

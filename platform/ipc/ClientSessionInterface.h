@@ -13,16 +13,11 @@
 
 #include "platform/Descriptor.h"
 #include "platform/Error.h"
+#include "platform/FileExtension.h"
 #include "platform/Function.h"
 #include "platform/Value.h"
 
 namespace kyt {
-
-// The descriptors that came with an upload: the open file and its folder.
-struct FileExtension {
-  Descriptor file;    // opened for reading by the client
-  Descriptor folder;  // its folder, opened with O_PATH
-};
 
 using StatesReply = Function<void(std::optional<Array>)>;  // back-end names, or none
 using StringReply = Function<void(String)>;

@@ -204,9 +204,11 @@ DBusConnection::Step DBusConnection::handleMessage(std::span<const std::byte> by
     if (step != Step::more) return step;
   }
   consumed = frame.size;
-  const char* problem = context_->dispatcher.handle(
-      message,
-      {.session = *exportedObject_, .output = output_, .descriptors = taken, .connectionNumber = number_});
+  const char* problem = context_->dispatcher.handle(message, {.session = *exportedObject_,
+                                                              .output = output_,
+                                                              .descriptors = taken,
+                                                              .connectionNumber = number_,
+                                                              .stream = *stream_});
   return problem == nullptr ? Step::more : breakOff(Reason::malformedMessage, problem);
 }
 

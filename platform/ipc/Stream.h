@@ -39,7 +39,7 @@ class Stream {
                                           std::vector<Descriptor>& descriptors) = 0;
   // Writes what the socket takes at once.
   [[nodiscard]] virtual StreamResult write(std::string_view bytes) = 0;
-  // What the kernel recorded about the peer when it connected. Asked once.
+  // What the kernel recorded about the peer when it connected: the same answer each time.
   [[nodiscard]] virtual PeerCredentials peer() = 0;
   // The peer's executable, for log lines; empty when it may not be known.
   [[nodiscard]] virtual std::string peerExecutable() const = 0;

@@ -3,8 +3,11 @@
 
 #include <gtest/gtest.h>
 
+#include "backends/ampyx/AmpyxBackend.h"
 #include "backends/dashboard/DashboardBackend.h"
 #include "backends/https/HTTPSPostBackend.h"
+#include "backends/qdx/QDXBackend.h"
+#include "backends/upload/UploadBackend.h"
 #include "platform/Keys.h"
 #include "tests/support/TestPlatform.h"
 
@@ -50,6 +53,28 @@ TEST(BackendTable, ADashboardWithoutAServerIsNoBackEnd) {
   ASSERT_TRUE(backends);
   EXPECT_TRUE(backends->empty());
   EXPECT_TRUE(platform.sink.contains("DashboardBackend(initWithName): can't resolve server IP"));
+}
+
+TEST(BackendTable, EachOtherNameStandsForItsOwnClass) {
+  TestPlatform platform;
+  DefaultBackendFactory factory(platform.configuration, backendTable(platform.configuration));
+  const auto make = [&](const char* name) {
+    return factory.newBackendWithName(name, Dictionary{{"post_url", "https://u"}}, std::nullopt, 7);
+  };
+  EXPECT_NE(dynamic_cast<UploadBackend*>(make(kKYTReportingBackendUploadServer).get()), nullptr);
+  EXPECT_NE(dynamic_cast<AmpyxBackend*>(make(kKYTReportingBackendAmpyx).get()), nullptr);
+  EXPECT_NE(dynamic_cast<QDXBackend*>(make(kKYTReportingBackendQDX).get()), nullptr);
+}
+
+TEST(BackendTable, NamesAreComparedInTheirOrder) {
+  TestPlatform platform;
+  std::vector<std::string> names;
+  for (const BackendCreator& creator : backendTable(platform.configuration))
+    names.push_back(creator.name.str());
+  EXPECT_EQ(names, (std::vector<std::string>{kKYTReportingBackendDashboard, kKYTReportingBackendUploadServer,
+                                             kKYTReportingBackendHTTPPost, kKYTReportingBackendHTTPPost2,
+                                             kKYTReportingBackendAmpyx, kKYTReportingBackendQRS,
+                                             kKYTReportingBackendQDX}));
 }
 
 TEST(BackendTable, AProfileThatIsNoDictionaryMakesNoBackEnd) {

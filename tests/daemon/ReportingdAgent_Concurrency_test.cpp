@@ -18,11 +18,29 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
   serve(releaseBag(Dictionary{{"httppost", Dictionary{{"clients", Array{entry}}}}}));
   // The platform of the fixture, but with a deflate that several threads may use.
   Platform& fakes = test_.platform;
-  Platform platform{
-      fakes.limits,  fakes.counters,     fakes.log,           fakes.clock,        fakes.timers,
-      fakes.reactor, fakes.executor,     fakes.random,        fakes.userDefaults, fakes.deviceProperties,
-      fakes.consent, fakes.cryptography, fakes.propertyLists, fakes.json,         test_.zlib,
-      fakes.memory,  fakes.urlSessions,  fakes.udpSockets,    fakes.clientBundle, fakes.daemonBundle};
+  Platform platform{fakes.limits,
+                    fakes.counters,
+                    fakes.log,
+                    fakes.clock,
+                    fakes.timers,
+                    fakes.reactor,
+                    fakes.executor,
+                    fakes.random,
+                    fakes.userDefaults,
+                    fakes.deviceProperties,
+                    fakes.consent,
+                    fakes.cryptography,
+                    fakes.propertyLists,
+                    fakes.json,
+                    test_.zlib,
+                    fakes.memory,
+                    fakes.urlSessions,
+                    fakes.udpSockets,
+                    fakes.clientBundle,
+                    fakes.daemonBundle,
+                    fakes.fileExtensions,
+                    fakes.pluginBundles,
+                    fakes.powerLog};
   Configuration configuration{platform, test_.deviceIdentity, test_.environment};
   DefaultBackendFactory factory(configuration, backendTable(configuration));
   ReportingdSessionClass sessionClass(configuration, factory, messageLog_);

@@ -13,6 +13,9 @@
 #include "platform/fake/FakeBundle.h"
 #include "platform/fake/FakeConsent.h"
 #include "platform/fake/FakeDeviceProperties.h"
+#include "platform/fake/FakeFileExtensions.h"
+#include "platform/fake/FakePluginBundles.h"
+#include "platform/fake/FakePowerLog.h"
 #include "platform/fake/FakeUDPSocket.h"
 #include "platform/fake/FakeUrlSession.h"
 #include "platform/fake/FakeUserDefaults.h"
@@ -53,11 +56,15 @@ struct TestPlatform {
   FakeURLSessionFactory urlSessions;
   FakeUDPSockets udpSockets;
   FakeBundle clientBundle, daemonBundle;
+  FakeFileExtensions fileExtensions;
+  FakePluginBundles pluginBundles;
+  FakePowerLog powerLog;
 
-  Platform platform{limits,  counters,     log,           clock,        timers,
-                    reactor, executor,     random,        userDefaults, deviceProperties,
-                    consent, cryptography, propertyLists, json,         deflate,
-                    memory,  urlSessions,  udpSockets,    clientBundle, daemonBundle};
+  Platform platform{limits,         counters,      log,           clock,        timers,
+                    reactor,        executor,      random,        userDefaults, deviceProperties,
+                    consent,        cryptography,  propertyLists, json,         deflate,
+                    memory,         urlSessions,   udpSockets,    clientBundle, daemonBundle,
+                    fileExtensions, pluginBundles, powerLog};
 
   DeviceIdentity deviceIdentity{platform};
   Environment environment{platform, deviceIdentity,

@@ -1,0 +1,39 @@
+#include "backends/ampyx/AmpyxBackend.h"
+
+#include <utility>
+
+#include "platform/Platform.h"
+#include "platform/PowerLog.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr uint32_t kAgent = 28;
+constexpr char kEventName[] = "Medsrv-KYT";
+
+}  // namespace
+
+std::shared_ptr<AmpyxBackend> AmpyxBackend::initWithName(Configuration& configuration, String name,
+                                                         Dictionary profile,
+                                                         std::optional<String> productFamily) {
+  struct Made final : AmpyxBackend {
+    Made(Platform& p, String n, Dictionary d, std::optional<String> f)
+        : AmpyxBackend(p, std::move(n), std::move(d), std::move(f)) {}
+  };
+  return std::make_shared<Made>(configuration.platform, std::move(name), std::move(profile),
+                                std::move(productFamily));
+}
+
+Value AmpyxBackend::sendMessage(const Dictionary& message, const TimeValue&, uint16_t method,
+                                uint16_t respCode, EventID eventID) {
+  if (method == 0 || message.empty()) return {};
+  Dictionary entry = message;
+  entry.set("method", unsigned{method});
+  entry.set("respCode", unsigned{respCode});
+  entry.set("event", static_cast<unsigned>(eventID));
+  platform_.powerLog.registeredEvent(kAgent, kEventName, entry);
+  return {};
+}
+
+}  // namespace kyt

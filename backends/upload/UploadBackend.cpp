@@ -1,0 +1,177 @@
+#include "backends/upload/UploadBackend.h"
+
+#include <cctype>
+#include <cinttypes>
+#include <cstdio>
+#include <utility>
+#include <variant>
+
+#include "backend/PayloadCompression.h"
+#include "platform/Clock.h"
+#include "platform/Counters.h"
+#include "platform/FileExtension.h"
+#include "platform/Limits.h"
+#include "platform/Log.h"
+#include "platform/Platform.h"
+#include "platform/Semaphore.h"
+#include "platform/TextEscape.h"
+
+namespace kyt {
+
+namespace {
+
+constexpr char kDescription[] = "Vidcall AFRC log";
+
+// A scheme, a host and nothing that cannot stand in an address.
+bool isAddress(std::string_view url) {
+  std::string_view rest = url;
+  if (rest.starts_with("https://"))
+    rest.remove_prefix(8);
+  else if (rest.starts_with("http://"))
+    rest.remove_prefix(7);
+  else
+    return false;
+  if (rest.empty() || rest.front() == '/' || rest.front() == '?') return false;
+  for (const char c : url)
+    if (static_cast<unsigned char>(c) <= ' ' || c == 0x7f) return false;
+  return true;
+}
+
+}  // namespace
+
+std::string percentEncodedForQuery(std::string_view text) {
+  constexpr std::string_view allowed = "-._~!$&'()*+,;=:@/?";
+  constexpr char digits[] = "0123456789ABCDEF";
+  std::string out;
+  out.reserve(text.size());
+  for (const char c : text) {
+    const auto byte = static_cast<unsigned char>(c);
+    const bool plain = byte < 0x80 && (std::isalnum(byte) != 0 || allowed.find(c) != allowed.npos);
+    if (plain) {
+      out += c;
+      continue;
+    }
+    out += '%';
+    out += digits[byte >> 4];
+    out += digits[byte & 15];
+  }
+  return out;
+}
+
+std::string_view lastPathComponent(std::string_view path) {
+  while (path.size() > 1 && path.ends_with('/')) path.remove_suffix(1);
+  const size_t slash = path.rfind('/');
+  return slash == path.npos || path.size() == 1 ? path : path.substr(slash + 1);
+}
+
+std::shared_ptr<UploadBackend> UploadBackend::initWithName(Configuration& configuration, String name,
+                                                           Dictionary profile,
+                                                           std::optional<String> productFamily) {
+  struct Made final : UploadBackend {
+    Made(Platform& p, String n, Dictionary d, std::optional<String> f)
+        : UploadBackend(p, std::move(n), std::move(d), std::move(f)) {}
+  };
+  const Value* url = profile.find("post_url");
+  const String* postURL = url != nullptr ? url->string() : nullptr;
+  if (postURL == nullptr) {
+    configuration.platform.log.error("UploadBackend(initWithName): can't resolve upload post URL.");
+    return nullptr;
+  }
+  const auto backend = std::make_shared<Made>(configuration.platform, std::move(name), std::move(profile),
+                                              std::move(productFamily));
+  backend->uploadURL_ = *postURL;
+  if (const Value* displayURL = backend->profile_.find("display_url"); displayURL != nullptr)
+    if (const String* text = displayURL->string()) backend->displayURL_ = *text;
+  return backend;
+}
+
+bool UploadBackend::uploadFileAtPath(const String& path, const String& extensionToken,
+                                     std::optional<FileExtension>& extension) {
+  Log& log = platform_.log;
+  log.normal("UploadBackend(uploadFileAtPath): Uploading file %s", path.c_str());
+  if (!uploadURL_) return false;
+  const std::unique_ptr<FileAccess> file = platform_.fileExtensions.consume(extensionToken, extension);
+  if (file == nullptr || !file->isReadableRegularFile()) {
+    log.error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
+    return false;
+  }
+  std::optional<Data> body = compressedFile(*file);
+  if (!body) return false;
+  const std::string_view name = lastPathComponent(path);
+  std::optional<URLRequest> request = newRequest(name, std::move(*body));
+  if (!request) {
+    log.error("UploadBackend(uploadFileAtPath): Unable to create URL request");
+    return false;
+  }
+  const auto poster = connectivityDelegate();
+  // Deliberately still true: the client's file was taken, and stays where it is.
+  if (poster == nullptr) {
+    platform_.counters.add(Reason::postWithoutPoster);
+    return true;
+  }
+  // A failed removal is no failure of the upload; whoever removes files counts it.
+  if (post(*poster, std::move(*request))) static_cast<void>(file->remove(name));
+  return true;
+}
+
+std::optional<Data> UploadBackend::compressedFile(FileAccess& file) {
+  Log& log = platform_.log;
+  const uint64_t most = platform_.limits.maxUploadBytes;
+  std::variant<Data, FileReadError> read = file.readWhole(most);
+  const FileReadError* error = std::get_if<FileReadError>(&read);
+  if (error != nullptr && *error == FileReadError::tooLarge) {
+    if (platform_.counters.addAndMayLog(Reason::uploadTooLarge, platform_.clock.monotonic()))
+      log.error("UploadBackend(uploadFileAtPath): Input file is over the limit of %" PRIu64 " bytes", most);
+    return std::nullopt;
+  }
+  // One that could not be read counts as empty.
+  const Data* contents = std::get_if<Data>(&read);
+  if (contents == nullptr || contents->empty()) {
+    log.error("UploadBackend(uploadFileAtPath): Input file is empty");
+    return std::nullopt;
+  }
+  return gzipDeflate(platform_, contents->bytes());
+}
+
+std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, Data body) const {
+  if (!isAddress(*uploadURL_)) return std::nullopt;
+  URLRequest request;
+  request.method = "POST";
+  const std::string compressedName = std::string(fileName) + ".gz";
+  request.url = formatObjects(
+      "%@?uuid=%s&sequence=%u&description=%@%%20(Uploaded%%20by%%20TQS)&filename=%@&raw=true",
+      {*uploadURL_, String(udid_ != nullptr ? udid_ : ""), sessionID_,
+       String(percentEncodedForQuery(kDescription)), String(percentEncodedForQuery(compressedName))});
+  request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
+  request.body = std::move(body);
+  return request;
+}
+
+bool UploadBackend::post(ReportingSessionConnectivityInterface& poster, URLRequest request) {
+  Semaphore answered;
+  std::optional<Data> reply;
+  std::optional<Error> failure;
+  poster.postURLRequestWithCompletionHandler(
+      std::move(request),
+      [&](std::optional<Data> data, const std::optional<URLResponse>&, std::optional<Error> error) {
+        if (!error) reply = std::move(data);
+        failure = std::move(error);
+        answered.signal();
+      });
+  answered.wait();
+  Log& log = platform_.log;
+  if (!reply) {
+    platform_.counters.add(Reason::postFailed);
+    log.error("UploadBackend(uploadFileAtPath): post %s",
+              failure ? failure->localizedDescription.c_str() : "(null)");
+    return false;
+  }
+  // The status is deliberately not looked at: servers of this kind say in the text whether they have the file.
+  const bool readable = isValidUTF8(reply->view());
+  const std::string text(readable ? reply->view() : "(null)");
+  log.normal("UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s", uploadURL_->c_str(),
+             text.c_str());
+  return readable && text.find("success") != std::string::npos;
+}
+
+}  // namespace kyt

@@ -1,0 +1,58 @@
+// Access to one file of a client, for one call: what stands here for a sandbox extension token. A client opens
+// the file and its folder and passes both descriptors with the call; the token's text names them and means
+// nothing else. Only those descriptors count: no path that a client names is ever opened.
+//
+// Used by back ends that upload files. Any thread; one access is used by one thread at a time. Reading and
+// removing wait for the client's file system; they announce that themselves (BlockingScope).
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "platform/Descriptor.h"
+#include "platform/Value.h"
+
+namespace kyt {
+
+// Whose rights a deletion needs: those of the connection's other end, as of the moment it connected.
+struct PeerIdentity {
+  uint32_t user = ~0u, group = ~0u;
+  std::vector<uint32_t> groups;  // supplementary
+};
+
+// The descriptors that came with an upload: the open file and its folder.
+struct FileExtension {
+  Descriptor file;    // opened for reading by the client
+  Descriptor folder;  // its folder, opened with O_PATH
+  PeerIdentity peer = {};
+};
+
+enum class FileReadError : uint8_t { tooLarge, failed };
+
+// What a consumed token gives. Released at destruction.
+class FileAccess {
+ public:
+  virtual ~FileAccess() = default;
+  // A regular file that was opened for reading. Nothing else may be read; asking reads nothing.
+  [[nodiscard]] virtual bool isReadableRegularFile() = 0;
+  // The file from its beginning, as long as it is when reading begins: what is appended meanwhile is left out,
+  // what is cut off is missing. One longer than `maxBytes` is not read.
+  [[nodiscard]] virtual std::variant<Data, FileReadError> readWhole(uint64_t maxBytes) = 0;
+  // Removes the folder's entry of that name with the rights of the client, provided that it is still this very
+  // file.
+  [[nodiscard]] virtual bool remove(std::string_view name) = 0;
+};
+
+class FileExtensions {
+ public:
+  virtual ~FileExtensions() = default;
+  // Takes the descriptors. Null for an empty token, and when none came with the call.
+  [[nodiscard]] virtual std::unique_ptr<FileAccess> consume(std::string_view token,
+                                                            std::optional<FileExtension>& extension) = 0;
+};
+
+}  // namespace kyt

@@ -1,0 +1,237 @@
+#include "platform/linux/system/DeletionBroker.h"
+
+#include <fcntl.h>
+#include <grp.h>
+#include <linux/capability.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/time.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/WorkerPool.h"
+
+namespace kyt {
+namespace {
+
+constexpr unsigned kChildSeconds = 5;
+constexpr int kPatienceMilliseconds = 6000;  // a little more than a child has
+constexpr size_t kLongestName = 255;
+constexpr int kDescriptors = 3;  // the file, its folder, where the answer goes
+constexpr uint32_t kNobody = ~0u;
+
+struct Request {
+  uint32_t user, group, groupCount, nameLength;
+  uint32_t groups[DeletionBroker::kMaxGroups];
+  char name[kLongestName + 1];
+};
+
+// ---- In the broker: nothing below allocates or takes a lock.
+
+struct Capabilities {
+  __user_cap_header_struct header = {_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct data[2] = {};
+  bool read() { return ::syscall(SYS_capget, &header, data) == 0; }
+  bool write() { return ::syscall(SYS_capset, &header, data) == 0; }
+  void keep(uint32_t mask) {
+    data[0].permitted &= mask;
+    data[0].effective = data[0].permitted;
+    data[0].inheritable = 0;
+    data[1] = {};
+  }
+};
+constexpr uint32_t kTakingUsers = 1U << CAP_SETUID | 1U << CAP_SETGID;
+
+bool mayTakeUsers() {
+  Capabilities capabilities;
+  return capabilities.read() && (capabilities.data[0].effective & kTakingUsers) == kTakingUsers;
+}
+
+// Leaves no capability, whoever this process was and is. 0 or errno.
+int become(const Request& request) {
+  if (request.user == kNobody || request.group == kNobody) return EPERM;
+  if (mayTakeUsers()) {
+    if (::setgroups(request.groupCount, request.groups) != 0) return errno;
+    if (::setresgid(request.group, request.group, request.group) != 0) return errno;
+    if (::setresuid(request.user, request.user, request.user) != 0) return errno;
+  }
+  uid_t real = 0, effective = 0, saved = 0;
+  if (::getresuid(&real, &effective, &saved) != 0) return errno;
+  if (real != request.user || effective != request.user || saved != request.user) return EPERM;
+  Capabilities capabilities;
+  if (!capabilities.read()) return errno;
+  capabilities.keep(0);
+  return capabilities.write() ? 0 : errno;
+}
+
+bool isName(const Request& request) {
+  if (request.nameLength == 0 || request.nameLength > kLongestName) return false;
+  if (::memchr(request.name, '/', request.nameLength) != nullptr) return false;
+  if (::memchr(request.name, '\0', request.nameLength) != nullptr) return false;
+  return ::strcmp(request.name, ".") != 0 && ::strcmp(request.name, "..") != 0;
+}
+
+int removeFile(const Request& request, int file, int folder) {
+  if (!isName(request)) return EINVAL;
+  if (const int error = become(request)) return error;
+  struct stat opened = {}, named = {};
+  if (::fstat(file, &opened) != 0) return errno;
+  if (!S_ISREG(opened.st_mode)) return EINVAL;
+  if (::fstatat(folder, request.name, &named, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (named.st_dev != opened.st_dev || named.st_ino != opened.st_ino) return ESTALE;
+  return ::unlinkat(folder, request.name, 0) == 0 ? 0 : errno;
+}
+
+struct Received {
+  ssize_t bytes = -1;
+  int descriptors[kDescriptors] = {-1, -1, -1};
+  bool whole = false;
+};
+
+Received receive(int socket, Request& request) {
+  alignas(cmsghdr) char control[CMSG_SPACE(kDescriptors * sizeof(int))];
+  iovec part = {&request, sizeof request};
+  msghdr message = {};
+  message.msg_iov = &part;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  Received received;
+  received.bytes = ::recvmsg(socket, &message, MSG_CMSG_CLOEXEC);
+  if (received.bytes <= 0) return received;
+  const cmsghdr* header = CMSG_FIRSTHDR(&message);
+  if (header == nullptr || header->cmsg_type != SCM_RIGHTS) return received;
+  const size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+  std::memcpy(received.descriptors, CMSG_DATA(header), count * sizeof(int));
+  received.whole = count == kDescriptors && received.bytes == sizeof request &&
+                   (message.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) == 0 &&
+                   request.groupCount <= DeletionBroker::kMaxGroups && request.nameLength <= kLongestName;
+  request.name[kLongestName] = '\0';
+  return received;
+}
+
+[[noreturn]] void serve(int socket) {
+  // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
+  for (const int ignored : {SIGINT, SIGTERM, SIGHUP, SIGPIPE}) ::signal(ignored, SIG_IGN);
+  ::signal(SIGCHLD, SIG_IGN);  // children leave nothing behind
+  ::signal(SIGALRM, SIG_DFL);
+  sigset_t none;
+  ::sigemptyset(&none);
+  ::sigprocmask(SIG_SETMASK, &none, nullptr);
+  ::prctl(PR_SET_NAME, "kyt-broker");
+  ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
+  ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
+  if (::chdir("/") != 0) ::_exit(1);
+  if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
+  ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
+  Capabilities capabilities;
+  if (!capabilities.read()) ::_exit(1);
+  capabilities.keep(kTakingUsers);
+  if (!capabilities.write()) ::_exit(1);
+  static Request request;
+  while (true) {
+    request = {};
+    const Received received = receive(socket, request);
+    if (received.bytes < 0 && errno == EINTR) continue;
+    if (received.bytes <= 0) ::_exit(0);
+    if (received.whole && ::fork() == 0) {
+      ::alarm(kChildSeconds);
+      const int32_t result = removeFile(request, received.descriptors[0], received.descriptors[1]);
+      (void)::send(received.descriptors[2], &result, sizeof result, MSG_NOSIGNAL);
+      ::_exit(0);
+    }
+    for (const int descriptor : received.descriptors)
+      if (descriptor >= 0) ::close(descriptor);
+  }
+}
+
+// ---- In the daemon.
+
+bool sendRequest(int socket, const Request& request, const int (&descriptors)[kDescriptors]) {
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof descriptors)] = {};
+  iovec part = {const_cast<Request*>(&request), sizeof request};
+  msghdr message = {};
+  message.msg_iov = &part;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  cmsghdr* header = CMSG_FIRSTHDR(&message);
+  header->cmsg_level = SOL_SOCKET;
+  header->cmsg_type = SCM_RIGHTS;
+  header->cmsg_len = CMSG_LEN(sizeof descriptors);
+  std::memcpy(CMSG_DATA(header), descriptors, sizeof descriptors);
+  return ::sendmsg(socket, &message, MSG_NOSIGNAL) == static_cast<ssize_t>(sizeof request);
+}
+
+int awaitAnswer(int socket) {
+  pollfd answer = {socket, POLLIN, 0};
+  const BlockingScope blocking;
+  const int ready = ::poll(&answer, 1, kPatienceMilliseconds);
+  if (ready == 0) return ETIMEDOUT;
+  int32_t result = 0;
+  // The end of the stream: the child was ended by its alarm, or there is no broker.
+  if (ready < 0 || ::recv(socket, &result, sizeof result, 0) != sizeof result) return EIO;
+  return result;
+}
+
+}  // namespace
+
+std::variant<std::unique_ptr<DeletionBroker>, std::string> DeletionBroker::start() {
+  int ends[2];
+  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
+    return "socketpair: " + errorText(errno);
+  FileHandle mine(ends[0]), theirs(ends[1]);
+  const pid_t child = ::fork();
+  if (child < 0) return "fork: " + errorText(errno);
+  if (child == 0) serve(theirs.get());
+  const timeval patience = {2, 0};
+  ::setsockopt(mine.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+  return std::unique_ptr<DeletionBroker>(new DeletionBroker(std::move(mine), child));
+}
+
+DeletionBroker::~DeletionBroker() {
+  { const FileHandle closed = std::move(socket_); }
+  int status = 0;
+  while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
+  }
+}
+
+int DeletionBroker::remove(int file, int folder, std::string_view name, const PeerIdentity& peer) const {
+  if (file < 0 || folder < 0) return EBADF;
+  if (name.empty() || name.size() > kLongestName || peer.groups.size() > kMaxGroups) return EINVAL;
+  const auto request = std::make_unique<Request>();
+  request->user = peer.user;
+  request->group = peer.group;
+  request->groupCount = static_cast<uint32_t>(peer.groups.size());
+  request->nameLength = static_cast<uint32_t>(name.size());
+  if (!peer.groups.empty())
+    std::memcpy(request->groups, peer.groups.data(), peer.groups.size() * sizeof(uint32_t));
+  name.copy(request->name, name.size());
+
+  int ends[2];
+  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) return errno;
+  const FileHandle mine(ends[0]);
+  {
+    const FileHandle theirs(ends[1]);
+    if (!sendRequest(socket_.get(), *request, {file, folder, theirs.get()})) return errno != 0 ? errno : EIO;
+  }
+  return awaitAnswer(mine.get());
+}
+
+void DeletionBroker::giveUpTakingUsers() {
+  Capabilities capabilities;
+  if (!capabilities.read()) return;
+  capabilities.data[0].effective &= ~kTakingUsers;
+  capabilities.data[0].permitted &= ~kTakingUsers;
+  capabilities.data[0].inheritable &= ~kTakingUsers;
+  (void)capabilities.write();
+}
+
+}  // namespace kyt

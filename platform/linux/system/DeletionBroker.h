@@ -1,0 +1,52 @@
+// Removes files of clients with the clients' own rights, on behalf of the daemon, which is confined and has
+// none of its own.
+//
+// A small process ("kyt-broker") is forked before the confinement is entered. It knows one request: an open
+// file, its folder, a name, and whose rights to use; for each it forks a child that takes that user and those
+// groups and nothing else (no capability), checks that the name in that folder is still this very file
+// (device and inode), removes it and answers with errno. A client's file system that never answers holds such
+// a child alone, and an alarm ends it. Between check and removal the client could put another file there:
+// that is then removed with its own rights, so nobody but itself is harmed.
+//
+// Where the daemon was started by an ordinary user, the broker serves clients of that user alone.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <variant>
+
+#include "platform/FileExtension.h"
+#include "platform/linux/system/Files.h"
+
+namespace kyt {
+
+// Any thread.
+class DeletionBroker {
+ public:
+  static constexpr size_t kMaxGroups =
+      1024;  // supplementary groups of a client; one that has more is refused
+
+  // Only before there are threads and before the confinement. An error's text when it cannot be started.
+  [[nodiscard]] static std::variant<std::unique_ptr<DeletionBroker>, std::string> start();
+  ~DeletionBroker();  // ends the process and waits for it
+  DeletionBroker(const DeletionBroker&) = delete;
+  DeletionBroker& operator=(const DeletionBroker&) = delete;
+
+  // 0, or errno: ESTALE when the name is another file now, EPERM for a user that it may not serve, ETIMEDOUT.
+  // Waits for the answer, some seconds at most.
+  [[nodiscard]] int remove(int file, int folder, std::string_view name, const PeerIdentity& peer) const;
+
+  // From here on this process and its threads cannot take another user or group: that is the broker's alone.
+  static void giveUpTakingUsers();
+
+ private:
+  DeletionBroker(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
+
+  FileHandle socket_;
+  const int32_t child_;
+};
+
+}  // namespace kyt

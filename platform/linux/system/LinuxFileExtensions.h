@@ -1,0 +1,33 @@
+// Access to clients' files through the descriptors that they passed: read here, removed by the broker.
+//
+// A file is read with positions of its own and never mapped into memory: the client shares the descriptor's
+// position, and may cut the file at any moment.
+#pragma once
+
+#include <memory>
+#include <optional>
+
+#include "platform/FileExtension.h"
+#include "platform/linux/system/DeletionBroker.h"
+
+namespace kyt {
+
+class Counters;
+class Log;
+
+class LinuxFileExtensions final : public FileExtensions {
+ public:
+  // Without a broker (null) files are never removed. All outlive the accesses.
+  LinuxFileExtensions(const DeletionBroker* broker, Log& log, Counters& counters)
+      : broker_(broker), log_(log), counters_(counters) {}
+  [[nodiscard]] std::unique_ptr<FileAccess> consume(std::string_view token,
+                                                    std::optional<FileExtension>& extension) override;
+
+ private:
+  class Access;
+  const DeletionBroker* const broker_;
+  Log& log_;
+  Counters& counters_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,283 @@
+// One file's upload: what is refused before anything is sent, what is sent, and what a reply means.
+#include "backends/upload/UploadBackend.h"
+
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <thread>
+#include <utility>
+
+#include "platform/Keys.h"
+#include "platform/SerialQueue.h"
+#include "platform/WorkerPool.h"
+#include "tests/support/Eventually.h"
+#include "tests/support/TestPlatform.h"
+
+namespace kyt {
+namespace {
+
+// Answers each request on a thread of its own, as a URL session's queue does.
+class ThreadedPoster final : public ReportingSessionConnectivityInterface {
+ public:
+  using Answer = std::function<void(URLCompletion&)>;
+  explicit ThreadedPoster(Answer answer) : answer_(std::move(answer)) {}
+  void postURLRequestWithCompletionHandler(URLRequest request, URLCompletion completion) override {
+    requests.push_back(std::move(request));
+    threads_.emplace_back([this, completion = std::move(completion)]() mutable { answer_(completion); });
+  }
+  std::vector<URLRequest> requests;
+
+ private:
+  const Answer answer_;
+  std::vector<std::jthread> threads_;
+};
+
+ThreadedPoster::Answer reply(std::string text, int status = 200) {
+  return [text = std::move(text), status](URLCompletion& completion) {
+    URLResponse response;
+    response.status = status;
+    completion(Data(std::string_view(text)), response, std::nullopt);
+  };
+}
+
+std::string unzipped(const Data& body) {
+  z_stream stream = {};
+  EXPECT_EQ(inflateInit2(&stream, 31), Z_OK);
+  std::string out(1 << 20, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(body.view().data()));
+  stream.avail_in = static_cast<uInt>(body.size());
+  stream.next_out = reinterpret_cast<Bytef*>(out.data());
+  stream.avail_out = static_cast<uInt>(out.size());
+  EXPECT_EQ(inflate(&stream, Z_FINISH), Z_STREAM_END);
+  out.resize(stream.total_out);
+  inflateEnd(&stream);
+  return out;
+}
+
+class Upload : public testing::Test {
+ protected:
+  UploadBackend& backend() {
+    if (backend_ == nullptr) {
+      backend_ = UploadBackend::initWithName(platform_.configuration, kKYTReportingBackendUploadServer,
+                                             profile_, String("Phone"));
+      backend_->setSessionID(4294967295U);
+      backend_->setUdid("0123456789abcdef");
+      backend_->setReportingSessionConnectivityDelegate(poster_);
+    }
+    return *backend_;
+  }
+  bool upload(const char* path = "/tmp/report.log", const char* token = "token") {
+    std::optional<FileExtension> extension;
+    const bool sent = backend().uploadFileAtPath(path, token, extension);
+    EXPECT_EQ(platform_.fileExtensions.held, 0) << "the access is still held";
+    return sent;
+  }
+  void answer(ThreadedPoster::Answer how) { poster_ = std::make_shared<ThreadedPoster>(std::move(how)); }
+  bool logged(LogLevel level, std::string_view line) { return platform_.sink.contains(level, line); }
+  const std::vector<std::string>& removed() { return platform_.fileExtensions.removed; }
+
+  TestPlatform platform_;
+  std::shared_ptr<ThreadedPoster> poster_ = std::make_shared<ThreadedPoster>(reply("{}"));
+  Dictionary profile_{{"post_url", "https://upload.example.org/in"}, {"display_url", "https://show"}};
+  std::shared_ptr<UploadBackend> backend_;
+};
+
+TEST_F(Upload, NeedsAnAddress) {
+  for (const Dictionary& profile : {Dictionary{}, Dictionary{{"post_url", 7}}}) {
+    platform_.sink.clear();
+    EXPECT_EQ(UploadBackend::initWithName(platform_.configuration, "uploadserver", profile, std::nullopt),
+              nullptr);
+    EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(initWithName): can't resolve upload post URL."));
+  }
+}
+
+TEST_F(Upload, TakesItsAddressesFromTheProfile) {
+  EXPECT_EQ(backend().uploadURL(), String("https://upload.example.org/in"));
+  EXPECT_EQ(backend().displayURL(), String("https://show"));
+  EXPECT_EQ(backend().productFamily(), String("Phone"));
+}
+
+TEST_F(Upload, TakesNoEvents) {
+  EXPECT_TRUE(backend().sendMessage(Dictionary{{"a", 1}}, TimeValue{}, 1, 2, MessageFlag{3}).isNull());
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(Upload, SendsTheWholeFileCompressed) {
+  EXPECT_TRUE(upload());
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  const URLRequest& request = poster_->requests[0];
+  EXPECT_EQ(request.method, "POST");
+  EXPECT_EQ(request.url,
+            "https://upload.example.org/in?uuid=0123456789abcdef&sequence=4294967295"
+            "&description=Vidcall%20AFRC%20log%20(Uploaded%20by%20TQS)&filename=report.log.gz&raw=true");
+  EXPECT_EQ(request.headers,
+            (std::vector<std::pair<std::string, std::string>>{{"Content-Type", "application/octet-stream"},
+                                                              {"Content-Encoding", "gzip"}}));
+  EXPECT_EQ(unzipped(request.body), "contents");
+  EXPECT_TRUE(logged(LogLevel::normal, "UploadBackend(uploadFileAtPath): Uploading file /tmp/report.log"));
+}
+
+TEST_F(Upload, ARepliesSuccessRemovesTheFile) {
+  answer(reply(R"({"status":"success"})"));
+  EXPECT_TRUE(upload("/tmp/a b.log"));
+  EXPECT_EQ(removed(), std::vector<std::string>{"a b.log"});
+  EXPECT_NE(poster_->requests[0].url.find("&filename=a%20b.log.gz&"), std::string::npos);
+  EXPECT_TRUE(logged(LogLevel::normal,
+                     "UploadBackend(uploadFileAtPath): sending to |https://upload.example.org/in|, "
+                     "Json output: {\"status\":\"success\"}"));
+}
+
+TEST_F(Upload, AnyReplyWithoutThatWordKeepsTheFile) {
+  for (const char* text : {"", "{}", "{\"status\":\"Success\"}", "succes"}) {
+    backend_ = nullptr;
+    answer(reply(text));
+    EXPECT_TRUE(upload()) << text;
+    EXPECT_TRUE(removed().empty()) << text;
+  }
+}
+
+TEST_F(Upload, OnlyTheWordCountsAndNotTheStatus) {
+  answer(reply("success", 500));
+  EXPECT_TRUE(upload());
+  EXPECT_EQ(removed().size(), 1u);
+}
+
+TEST_F(Upload, AReplyThatIsNoTextKeepsTheFile) {
+  answer(reply("success\xff"));
+  EXPECT_TRUE(upload());
+  EXPECT_TRUE(removed().empty());
+  EXPECT_TRUE(logged(LogLevel::normal,
+                     "UploadBackend(uploadFileAtPath): sending to |https://upload.example.org/in|, "
+                     "Json output: (null)"));
+}
+
+TEST_F(Upload, AFailedPostKeepsTheFileAndIsStillTrue) {
+  answer([](URLCompletion& completion) {
+    completion(std::nullopt, std::nullopt, Error{kKYTURLErrorDomain, 7, "no route to success"});
+  });
+  EXPECT_TRUE(upload());
+  EXPECT_TRUE(removed().empty());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post no route to success"));
+  EXPECT_EQ(platform_.counters.value(Reason::postFailed), 1u);
+}
+
+TEST_F(Upload, WithoutAPosterNothingIsSentAndItIsStillTrue) {
+  static_cast<void>(backend());
+  poster_.reset();
+  EXPECT_TRUE(upload());
+  EXPECT_TRUE(removed().empty());
+  EXPECT_EQ(platform_.counters.value(Reason::postWithoutPoster), 1u);
+}
+
+TEST_F(Upload, WithoutAnAddressTheTokenIsNotConsumed) {
+  backend().setUploadURL(std::nullopt);
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(platform_.fileExtensions.tokens.empty());
+}
+
+TEST_F(Upload, ATokenThatGrantsNothingIsRefused) {
+  platform_.fileExtensions.grants = false;
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Only upload a regular file."));
+  EXPECT_EQ(platform_.fileExtensions.tokens, std::vector<std::string>{"token"});
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(Upload, OnlyARegularFileIsUploaded) {
+  platform_.fileExtensions.regular = false;
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Only upload a regular file."));
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(Upload, AnEmptyFileIsRefusedAndKept) {
+  platform_.fileExtensions.contents.clear();
+  answer(reply("success"));
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Input file is empty"));
+  EXPECT_TRUE(removed().empty());
+}
+
+TEST_F(Upload, AFileThatCannotBeReadCountsAsEmpty) {
+  platform_.fileExtensions.readable = false;
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Input file is empty"));
+}
+
+TEST_F(Upload, AFileOverTheLimitIsRefusedAndCounted) {
+  platform_.limits.maxUploadBytes = 8;
+  EXPECT_TRUE(upload());
+  platform_.limits.maxUploadBytes = 7;
+  EXPECT_FALSE(upload());
+  EXPECT_FALSE(upload());
+  EXPECT_EQ(platform_.counters.value(Reason::uploadTooLarge), 2u);
+  EXPECT_EQ(platform_.sink.count(LogLevel::error,
+                                 "UploadBackend(uploadFileAtPath): Input file is over the limit of 7 bytes"),
+            1u);
+}
+
+TEST_F(Upload, AFileThatCannotBeCompressedIsRefused) {
+  platform_.deflate.faults.initialize = -4;
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
+  for (const char* url : {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "http://a b/"}) {
+    backend_ = nullptr;
+    platform_.sink.clear();
+    profile_.set("post_url", url);
+    EXPECT_FALSE(upload()) << url;
+    EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Unable to create URL request"))
+        << url;
+  }
+  EXPECT_TRUE(poster_->requests.empty());
+}
+
+// The server does not answer: the thread waits, and says so to the pool that it belongs to.
+TEST_F(Upload, BlocksItsWorkerUntilTheReplyAndLetsOthersRun) {
+  std::atomic<bool> released{false};
+  answer([&](URLCompletion& completion) {
+    EXPECT_TRUE(eventually([&] { return released.load(); }));
+    reply("success")(completion);
+  });
+  static_cast<void>(backend());
+  WorkerPoolOptions options;
+  options.runnable = 1;
+  WorkerPool pool(options);
+  const auto uploads = SerialQueue::create("uploads", pool), others = SerialQueue::create("others", pool);
+  std::atomic<bool> uploaded{false}, otherRan{false};
+  uploads->async([&] { uploaded = upload(); });
+  ASSERT_TRUE(eventually([&] { return platform_.fileExtensions.held == 1; }));
+  others->async([&] { otherRan = true; });
+  EXPECT_TRUE(eventually([&] { return otherRan.load(); }));
+  EXPECT_FALSE(uploaded);
+  released = true;
+  EXPECT_TRUE(eventually([&] { return uploaded.load(); }));
+  EXPECT_EQ(removed(), std::vector<std::string>{"report.log"});
+  pool.shutDown();
+}
+
+TEST(PercentEncodedForQuery, KeepsWhatAQueryMayHold) {
+  const std::string allowed = "ABCXYZabcxyz0189-._~!$&'()*+,;=:@/?";
+  EXPECT_EQ(percentEncodedForQuery(allowed), allowed);
+  EXPECT_EQ(percentEncodedForQuery(" \"#%<>[\\]^`{|}\x7f\n"),
+            "%20%22%23%25%3C%3E%5B%5C%5D%5E%60%7B%7C%7D%7F%0A");
+  EXPECT_EQ(percentEncodedForQuery("\xc3\xa9"), "%C3%A9");
+}
+
+TEST(LastPathComponent, IsWhatStandsBehindTheLastSlash) {
+  EXPECT_EQ(lastPathComponent("/tmp/report.log"), "report.log");
+  EXPECT_EQ(lastPathComponent("/tmp/folder//"), "folder");
+  EXPECT_EQ(lastPathComponent("report"), "report");
+  EXPECT_EQ(lastPathComponent("/"), "/");
+  EXPECT_EQ(lastPathComponent(""), "");
+}
+
+}  // namespace
+}  // namespace kyt
