@@ -74,8 +74,8 @@ Post postOf(const Request& request) {
 }
 
 // The answer to a post that was kept, by its verdict.
-Reply verdict(const Post& post, unsigned status) {
-  if (post.good) return {200, "{}", "application/json", {}};
+Reply verdict(const Post& post, unsigned status, const char* goodAnswer) {
+  if (post.good) return {200, goodAnswer, "application/json", {}};
   return text(status, post.reason);
 }
 
@@ -92,10 +92,12 @@ Router::Router(const Options& options, Store& store, const PostChecker& checker,
       acknowledgements_(acknowledgements),
       queries_(store, checker),
       storebags_(options.bags, options.maxAge, std::move(signer)),
+      uploads_(options.state / "uploads", options.maxInflatedBytes),
       pagePolicy_(policyOfPage()) {}
 
 uint64_t Router::bodyLimit(const Request& request) const {
-  return takesPosts(request) || takesLogData(request) ? options_.maxBodyBytes : kMaxControlBytes;
+  const bool large = takesPosts(request) || takesUploads(request) || takesLogData(request);
+  return large ? options_.maxBodyBytes : kMaxControlBytes;
 }
 
 bool Router::takesPosts(const Request& request) const {
@@ -104,6 +106,10 @@ bool Router::takesPosts(const Request& request) const {
 
 bool Router::takesLogData(const Request& request) const {
   return isBelow(request.path, "/logdata") && (request.secure || options_.httpEvents);
+}
+
+bool Router::takesUploads(const Request& request) const {
+  return isBelow(request.path, "/upload") && (request.secure || options_.httpEvents);
 }
 
 // The page and its queries answer only to a browser that opened the page itself, and to programs: no other
@@ -120,9 +126,38 @@ bool Router::comesFromThisPlace(const Request& request) const {
   return std::find(options_.hosts.begin(), options_.hosts.end(), name) != options_.hosts.end();
 }
 
+template <typename Judge>
+Answer Router::answerPost(Request& request, const char* goodAnswer, Judge judge) {
+  if (request.method != "POST") return notAllowed("POST");
+  Post post = postOf(request);
+  unsigned status = 400;
+  if (request.tooLarge) {
+    status = 413;
+    post.reason = "the body is over the limit of " + std::to_string(options_.maxBodyBytes) + " bytes";
+  } else if (!request.contentLength) {
+    status = 411;
+    post.reason = "Content-Length is missing";
+    post.body = std::move(request.body);
+  } else {
+    post.body = std::move(request.body);
+    judge(post);
+  }
+  const std::optional<ReplyRule> rule = rules_.take(request.path);
+  Reply reply = verdict(post, status, goodAnswer);
+  const bool unanswered = rule && (rule->hang || rule->close);
+  post.answered = unanswered ? 0 : rule && rule->status ? *rule->status : reply.status;
+  store_.add(std::move(post));
+  return applyRule(rule, std::move(reply));
+}
+
 Answer Router::answer(Request& request) {
   const std::string_view path = request.path;
-  if (takesPosts(request)) return answerEvents(request);
+  if (takesPosts(request)) return answerPost(request, "{}", [this](Post& post) { checker_.check(post); });
+  if (takesUploads(request)) {
+    // Devices remove a file once the answer has the word "success" in it.
+    return answerPost(request, R"({"result":"success"})",
+                      [this, &request](Post& post) { uploads_.keep(request, post); });
+  }
   if (takesLogData(request)) return answerLogData(request);
   if (isBelow(path, "/storebags/tolvar") || isBelow(path, "/bags/tolvar")) return answerStorebag(request);
   if (request.secure) return text(404, "nothing is here");
@@ -136,29 +171,6 @@ Answer Router::answer(Request& request) {
   Reply reply = queries_.answer(request);
   reply.headers.push_back({"Cache-Control", "no-store"});
   return reply;
-}
-
-Answer Router::answerEvents(Request& request) {
-  if (request.method != "POST") return notAllowed("POST");
-  Post post = postOf(request);
-  unsigned status = 400;
-  if (request.tooLarge) {
-    status = 413;
-    post.reason = "the body is over the limit of " + std::to_string(options_.maxBodyBytes) + " bytes";
-  } else if (!request.contentLength) {
-    status = 411;
-    post.reason = "Content-Length is missing";
-    post.body = std::move(request.body);
-  } else {
-    post.body = std::move(request.body);
-    checker_.check(post);
-  }
-  const std::optional<ReplyRule> rule = rules_.take(request.path);
-  Reply reply = verdict(post, status);
-  const bool unanswered = rule && (rule->hang || rule->close);
-  post.answered = unanswered ? 0 : rule && rule->status ? *rule->status : reply.status;
-  store_.add(std::move(post));
-  return applyRule(rule, std::move(reply));
 }
 
 // Good log data is answered with the place where it can be found, which is named after its content.
@@ -183,7 +195,7 @@ Answer Router::answerLogData(Request& request) {
 }
 
 void Router::broken(Request& request) {
-  if (!takesPosts(request) || request.method != "POST") return;
+  if (!(takesPosts(request) || takesUploads(request)) || request.method != "POST") return;
   Post post = postOf(request);
   post.reason = request.tooSlow
                     ? "the body was not whole in time, " + std::to_string(request.bodySize) + " bytes came"

@@ -14,6 +14,7 @@
 #include "devserver/Store.h"
 #include "devserver/Storebags.h"
 #include "devserver/Suspensions.h"
+#include "devserver/Uploads.h"
 
 namespace kyt::devserver {
 
@@ -28,10 +29,13 @@ class Router final : public HttpHandler {
 
  private:
   [[nodiscard]] bool takesPosts(const Request& request) const;
+  [[nodiscard]] bool takesUploads(const Request& request) const;
   [[nodiscard]] bool comesFromThisPlace(const Request& request) const;
   [[nodiscard]] bool takesLogData(const Request& request) const;
-  [[nodiscard]] Answer answerEvents(Request& request);
   [[nodiscard]] Answer answerLogData(Request& request);
+  // Keeps a post that `judge` looks at when it is whole; a good one is answered with that JSON.
+  template <typename Judge>
+  [[nodiscard]] Answer answerPost(Request& request, const char* goodAnswer, Judge judge);
   [[nodiscard]] Answer answerStorebag(const Request& request);
   [[nodiscard]] Answer answerControl(const Request& request);
   [[nodiscard]] Answer answerAcknowledgements(const Request& request);
@@ -50,6 +54,7 @@ class Router final : public HttpHandler {
   Queries queries_;
   ReplyRules rules_;
   Storebags storebags_;
+  const Uploads uploads_;
   const std::string pagePolicy_;
 };
 

@@ -1,0 +1,233 @@
+// Whose files the broker removes, which it leaves alone, and what it may do itself.
+#include "platform/linux/system/DeletionBroker.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <string>
+
+#include "tests/support/ChildProcess.h"
+#include "tests/support/Eventually.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+constexpr uint32_t kOther = 54321, kTheirGroup = 54322, kFurtherGroup = 54323;
+
+std::unique_ptr<DeletionBroker> startBroker() {
+  auto started = DeletionBroker::start();
+  if (const auto* error = std::get_if<std::string>(&started)) ADD_FAILURE() << *error;
+  return std::move(std::get<std::unique_ptr<DeletionBroker>>(started));
+}
+
+PeerIdentity myself() {
+  return {::geteuid(), ::getegid(), {}};
+}
+
+// The process that start() made: this process has no other child.
+pid_t brokerProcess() {
+  std::ifstream children("/proc/thread-self/children");
+  pid_t child = 0;
+  children >> child;
+  return child;
+}
+
+std::string statusOf(pid_t process, const std::string& key) {
+  std::ifstream status("/proc/" + std::to_string(process) + "/status");
+  for (std::string line; std::getline(status, line);)
+    if (line.starts_with(key + ":")) return line.substr(line.find_first_not_of(" \t", key.size() + 1));
+  return {};
+}
+
+class Broker : public testing::Test {
+ protected:
+  struct Opened {
+    FileHandle file, folder;
+  };
+  FileHandle folder() const {
+    return FileHandle(::open(folder_.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  }
+  Opened open(const std::string& name) const {
+    return {FileHandle(::open((folder_ / name).c_str(), O_RDONLY | O_CLOEXEC)), folder()};
+  }
+  int remove(const Opened& opened, std::string_view name, const PeerIdentity& peer = myself()) const {
+    return broker_->remove(opened.file.get(), opened.folder.get(), name, peer);
+  }
+  [[nodiscard]] bool exists(const std::string& name) const {
+    return std::filesystem::exists(std::filesystem::symlink_status(folder_ / name));
+  }
+
+  const TemporaryFolder folder_;
+  const std::unique_ptr<DeletionBroker> broker_ = startBroker();
+};
+
+TEST_F(Broker, RemovesTheNameThatIsStillTheFile) {
+  folder_.write("a", "1");
+  folder_.write("b", "2");
+  EXPECT_EQ(remove(open("a"), "a"), 0);
+  EXPECT_FALSE(exists("a"));
+  EXPECT_TRUE(exists("b"));
+}
+
+TEST_F(Broker, LeavesAFileThatTookItsPlace) {
+  folder_.write("a", "1");
+  const Opened opened = open("a");
+  std::filesystem::rename(folder_ / "a", folder_ / "old");
+  folder_.write("a", "another");
+  EXPECT_EQ(remove(opened, "a"), ESTALE);
+  EXPECT_EQ(folder_.read("a"), "another");
+  EXPECT_EQ(remove(opened, "old"), 0);
+}
+
+TEST_F(Broker, FollowsNoSymbolicLink) {
+  folder_.write("a", "1");
+  const Opened opened = open("a");
+  std::filesystem::rename(folder_ / "a", folder_ / "target");
+  std::filesystem::create_symlink("target", folder_ / "a");
+  EXPECT_EQ(remove(opened, "a"), ESTALE);
+  EXPECT_TRUE(exists("a"));
+  EXPECT_TRUE(exists("target"));
+}
+
+TEST_F(Broker, TakesOnlyPlainNames) {
+  folder_.write("a", "1");
+  folder_.write("sub/b", "2");
+  const Opened opened = open("a");
+  const Opened below = {FileHandle(::open((folder_ / "sub/b").c_str(), O_RDONLY | O_CLOEXEC)), folder()};
+  EXPECT_EQ(remove(below, "sub/b"), EINVAL);
+  EXPECT_EQ(remove(opened, "./a"), EINVAL);
+  EXPECT_EQ(remove(opened, (folder_ / "a")), EINVAL);
+  for (const std::string& name :
+       {std::string(), std::string("."), std::string(".."), std::string("a\0", 2), std::string(256, 'n')})
+    EXPECT_EQ(remove(opened, name), EINVAL) << name;
+  EXPECT_EQ(remove(opened, std::string(255, 'n')), ENOENT);
+  EXPECT_TRUE(exists("a"));
+  EXPECT_TRUE(exists("sub/b"));
+}
+
+TEST_F(Broker, RemovesNothingButRegularFiles) {
+  std::filesystem::create_directory(folder_ / "folder");
+  EXPECT_EQ(remove(open("folder"), "folder"), EINVAL);
+  ASSERT_EQ(::mkfifo((folder_ / "fifo").c_str(), 0600), 0);
+  const Opened fifo = {FileHandle(::open((folder_ / "fifo").c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC)),
+                       folder()};
+  EXPECT_EQ(remove(fifo, "fifo"), EINVAL);
+  EXPECT_TRUE(exists("fifo"));
+}
+
+TEST_F(Broker, NeedsBothDescriptors) {
+  folder_.write("a", "1");
+  const Opened opened = open("a");
+  EXPECT_EQ(broker_->remove(-1, opened.folder.get(), "a", myself()), EBADF);
+  EXPECT_EQ(broker_->remove(opened.file.get(), -1, "a", myself()), EBADF);
+  EXPECT_EQ(broker_->remove(opened.file.get(), opened.file.get(), "a", myself()), ENOTDIR);
+  EXPECT_TRUE(exists("a"));
+}
+
+TEST_F(Broker, ServesNobodyUnknown) {
+  folder_.write("a", "1");
+  const Opened opened = open("a");
+  EXPECT_EQ(remove(opened, "a", PeerIdentity{}), EPERM);
+  EXPECT_EQ(remove(opened, "a", {::geteuid(), ~0U, {}}), EPERM);
+  EXPECT_EQ(remove(opened, "a", {~0U, ::getegid(), {}}), EPERM);
+  EXPECT_EQ(remove(opened, "a",
+                   {::geteuid(), ::getegid(), std::vector<uint32_t>(DeletionBroker::kMaxGroups + 1, 7)}),
+            EINVAL);
+  EXPECT_TRUE(exists("a"));
+}
+
+TEST_F(Broker, TakesTheClientsUserAndGroupsAndNothingElse) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to take another user";
+  const PeerIdentity other{kOther, kTheirGroup, {kFurtherGroup}};
+  const auto tryAs = [&](const PeerIdentity& peer, uid_t owner, gid_t group, mode_t mode) {
+    folder_.write("a", "1");
+    EXPECT_EQ(::chown(folder_.path().c_str(), owner, group), 0);
+    EXPECT_EQ(::chmod(folder_.path().c_str(), mode), 0);
+    const int result = remove(open("a"), "a", peer);
+    EXPECT_EQ(exists("a"), result != 0);
+    return result;
+  };
+  EXPECT_EQ(tryAs(other, 0, 0, 0755), EACCES);
+  EXPECT_EQ(tryAs(other, kOther, 0, 0700), 0);
+  EXPECT_EQ(tryAs(other, 0, kTheirGroup, 0770), 0);
+  EXPECT_EQ(tryAs(other, 0, kFurtherGroup, 0770), 0);
+  EXPECT_EQ(tryAs({kOther, kTheirGroup, {}}, 0, kFurtherGroup, 0770), EACCES);
+  // Not even root's clients have root's power over the folders of others.
+  EXPECT_EQ(tryAs({0, 0, {}}, kOther, kTheirGroup, 0700), EACCES);
+  EXPECT_EQ(tryAs({0, 0, {}}, 0, 0, 0700), 0);
+  // A folder where each user may remove only what is its own.
+  EXPECT_EQ(tryAs(other, 0, 0, 01777), EPERM);
+}
+
+TEST_F(Broker, StartedByAnOrdinaryUserItServesThatUserAlone) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to become an ordinary user";
+  folder_.write("a", "1");
+  folder_.write("b", "1");
+  ASSERT_EQ(::chown(folder_.path().c_str(), kOther, kOther), 0);
+  const Opened a = open("a"), b = open("b");
+  EXPECT_EQ(inChildProcess([&]() -> std::string {
+              if (::setresgid(kOther, kOther, kOther) != 0 || ::setresuid(kOther, kOther, kOther) != 0)
+                return "cannot become an ordinary user";
+              const auto broker = startBroker();
+              const auto asUser = [&](const Opened& opened, const char* name, uint32_t user) {
+                return std::to_string(
+                           broker->remove(opened.file.get(), opened.folder.get(), name, {user, user, {}})) +
+                       " ";
+              };
+              return asUser(a, "a", kOther) + asUser(b, "b", 0) + asUser(b, "b", kOther + 1);
+            }),
+            "0 " + std::to_string(EPERM) + " " + std::to_string(EPERM) + " ");
+  EXPECT_FALSE(exists("a"));
+  EXPECT_TRUE(exists("b"));
+}
+
+TEST_F(Broker, HoldsNothingButThePowerToTakeUsers) {
+  const pid_t process = brokerProcess();
+  ASSERT_GT(process, 0);
+  ASSERT_TRUE(eventually([&] { return statusOf(process, "Name") == "kyt-broker"; }));
+  folder_.write("a", "1");
+  EXPECT_EQ(remove(open("a"), "a"), 0);  // it has finished starting
+  const std::string expected = ::geteuid() == 0 ? "00000000000000c0" : "0000000000000000";
+  EXPECT_EQ(statusOf(process, "CapEff"), expected);
+  EXPECT_EQ(statusOf(process, "CapPrm"), expected);
+  EXPECT_EQ(statusOf(process, "NoNewPrivs"), "1");
+}
+
+TEST_F(Broker, ThatIsGoneRemovesNothingAndHoldsNobody) {
+  const pid_t process = brokerProcess();
+  ASSERT_GT(process, 0);
+  ASSERT_EQ(::kill(process, SIGKILL), 0);
+  folder_.write("a", "1");
+  EXPECT_TRUE(eventually([&] { return remove(open("a"), "a") == EPIPE; }));
+  EXPECT_TRUE(exists("a"));
+}
+
+TEST_F(Broker, SurvivesASignalOfItsTerminal) {
+  const pid_t process = brokerProcess();
+  folder_.write("a", "1");
+  EXPECT_EQ(remove(open("a"), "a"), 0);
+  for (const int signal : {SIGINT, SIGTERM, SIGHUP}) ASSERT_EQ(::kill(process, signal), 0);
+  folder_.write("b", "1");
+  EXPECT_EQ(remove(open("b"), "b"), 0);
+}
+
+TEST(GiveUpTakingUsers, IsForGood) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to have something to give up";
+  EXPECT_EQ(inChildProcess([]() -> std::string {
+              DeletionBroker::giveUpTakingUsers();
+              if (::setresuid(kOther, kOther, kOther) == 0) return "became another user";
+              if (::setresgid(kOther, kOther, kOther) == 0) return "took another group";
+              return "";
+            }),
+            "");
+}
+
+}  // namespace
+}  // namespace kyt

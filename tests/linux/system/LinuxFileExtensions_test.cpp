@@ -1,0 +1,235 @@
+// What a client can and cannot make the daemon read and remove: everything that it may pass as a file, and
+// everything that may happen to the file meanwhile.
+#include "platform/linux/system/LinuxFileExtensions.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <filesystem>
+#include <string>
+#include <thread>
+
+#include "platform/Counters.h"
+#include "platform/fake/MemoryLogSink.h"
+#include "platform/linux/base/Descriptors.h"
+#include "tests/support/Eventually.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt {
+namespace {
+
+constexpr uint64_t kPlenty = 1 << 20;
+
+class FileExtensionTest : public testing::Test {
+ protected:
+  static std::unique_ptr<DeletionBroker> startBroker() {
+    auto started = DeletionBroker::start();
+    if (const auto* error = std::get_if<std::string>(&started)) ADD_FAILURE() << *error;
+    return std::move(std::get<std::unique_ptr<DeletionBroker>>(started));
+  }
+  Descriptor folder() const {
+    return ownDescriptor(::open(folder_.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  }
+  std::optional<FileExtension> extension(int file) const {
+    return FileExtension{ownDescriptor(file), folder(), {::geteuid(), ::getegid(), {}}};
+  }
+  std::unique_ptr<FileAccess> access(int file) {
+    auto given = extension(file);
+    return LinuxFileExtensions(broker_.get(), log_, counters_).consume("token", given);
+  }
+  std::unique_ptr<FileAccess> access(const std::string& path, int flags = O_RDONLY) {
+    const int file = ::open(path.c_str(), flags | O_CLOEXEC | O_NONBLOCK, 0600);
+    EXPECT_GE(file, 0) << path;
+    auto given = extension(file);
+    std::unique_ptr<FileAccess> taken = extensions_->consume("token", given);
+    EXPECT_FALSE(given);
+    return taken;
+  }
+  static std::string contents(FileAccess& file, uint64_t maxBytes = kPlenty) {
+    auto read = file.readWhole(maxBytes);
+    if (const auto* data = std::get_if<Data>(&read)) return std::string(data->view());
+    return std::get<FileReadError>(read) == FileReadError::tooLarge ? "(too large)" : "(failed)";
+  }
+  [[nodiscard]] bool exists(const std::string& name) const {
+    return std::filesystem::exists(std::filesystem::symlink_status(folder_ / name));
+  }
+
+  const TemporaryFolder folder_;
+  MemoryLogSink sink_;
+  Log log_{sink_, LogLevel::debug};
+  Counters counters_;
+  const std::unique_ptr<DeletionBroker> broker_ = startBroker();
+  std::unique_ptr<LinuxFileExtensions> extensions_ =
+      std::make_unique<LinuxFileExtensions>(broker_.get(), log_, counters_);
+};
+
+TEST_F(FileExtensionTest, ReadsAndRemovesTheFileThatWasPassed) {
+  const auto file = access(folder_.write("report.log", "contents"));
+  ASSERT_NE(file, nullptr);
+  EXPECT_TRUE(file->isReadableRegularFile());
+  EXPECT_EQ(contents(*file), "contents");
+  EXPECT_TRUE(file->remove("report.log")) << sink_.lines().back().line;
+  EXPECT_FALSE(exists("report.log"));
+}
+
+TEST_F(FileExtensionTest, OnlyDescriptorsCountAndNoTextOfAToken) {
+  const std::string mine = folder_.write("mine", "mine"), theirs = folder_.write("theirs", "theirs");
+  auto given = extension(::open(theirs.c_str(), O_RDONLY | O_CLOEXEC));
+  const auto first = extensions_->consume("the token", given);
+  ASSERT_NE(first, nullptr);
+  // The same text opens nothing a second time, and in another call what came with that call.
+  std::optional<FileExtension> none;
+  EXPECT_EQ(extensions_->consume("the token", none), nullptr);
+  EXPECT_EQ(extensions_->consume("the token", given), nullptr);
+  auto other = extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC));
+  const auto second = extensions_->consume("the token", other);
+  ASSERT_NE(second, nullptr);
+  EXPECT_EQ(contents(*second), "mine");
+  auto path = extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC));
+  const auto third = extensions_->consume(theirs, path);
+  ASSERT_NE(third, nullptr);
+  EXPECT_EQ(contents(*third), "mine");
+}
+
+TEST_F(FileExtensionTest, AnEmptyTokenAndMissingDescriptorsGrantNothing) {
+  const std::string path = folder_.write("a", "1");
+  auto given = extension(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  EXPECT_EQ(extensions_->consume("", given), nullptr);
+  std::optional<FileExtension> none;
+  EXPECT_EQ(extensions_->consume("token", none), nullptr);
+  std::optional<FileExtension> withoutFile = FileExtension{Descriptor(), folder(), {}};
+  EXPECT_EQ(extensions_->consume("token", withoutFile), nullptr);
+  std::optional<FileExtension> withoutFolder =
+      FileExtension{ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC)), Descriptor(), {}};
+  EXPECT_EQ(extensions_->consume("token", withoutFolder), nullptr);
+}
+
+TEST_F(FileExtensionTest, WhatIsNoRegularFileIsNotReadable) {
+  EXPECT_FALSE(access(folder_.path(), O_RDONLY | O_DIRECTORY)->isReadableRegularFile());
+  EXPECT_FALSE(access("/dev/zero")->isReadableRegularFile());
+  ASSERT_EQ(::mkfifo((folder_ / "fifo").c_str(), 0600), 0);
+  EXPECT_FALSE(access(folder_ / "fifo")->isReadableRegularFile());
+  int ends[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
+  const Descriptor other = ownDescriptor(ends[1]);
+  EXPECT_FALSE(access(ends[0])->isReadableRegularFile());
+}
+
+TEST_F(FileExtensionTest, WhatWasNotOpenedForReadingIsNotReadable) {
+  const std::string path = folder_.write("a", "1");
+  EXPECT_FALSE(access(path, O_WRONLY)->isReadableRegularFile());
+  EXPECT_FALSE(access(path, O_PATH)->isReadableRegularFile());
+  EXPECT_FALSE(access(path, O_WRONLY | O_RDWR)->isReadableRegularFile());  // for ioctl alone
+  EXPECT_TRUE(access(path, O_RDWR)->isReadableRegularFile());
+  EXPECT_TRUE(access(path, O_RDONLY)->isReadableRegularFile());
+}
+
+TEST_F(FileExtensionTest, ASymbolicLinkSwappedInLaterIsNeitherReadNorRemoved) {
+  folder_.write("secret", "secret");
+  const auto file = access(folder_.write("report", "report"));
+  std::filesystem::rename(folder_ / "report", folder_ / "moved");
+  std::filesystem::create_symlink("secret", folder_ / "report");
+  EXPECT_EQ(contents(*file), "report");
+  EXPECT_FALSE(file->remove("report"));
+  EXPECT_TRUE(exists("report"));
+  EXPECT_TRUE(exists("secret"));
+  EXPECT_EQ(counters_.value(Reason::fileNotRemoved), 1u);
+  EXPECT_TRUE(sink_.contains(LogLevel::debug, errorText(ESTALE)));
+}
+
+TEST_F(FileExtensionTest, AFileThatTookItsPlaceIsNotRemoved) {
+  const auto file = access(folder_.write("report", "report"));
+  std::filesystem::remove(folder_ / "report");
+  folder_.write("report", "newer");
+  EXPECT_FALSE(file->remove("report"));
+  EXPECT_EQ(folder_.read("report"), "newer");
+  EXPECT_TRUE(sink_.contains(LogLevel::debug,
+                             "LinuxFileExtensions(remove): Cannot remove report: " + errorText(ESTALE)));
+}
+
+TEST_F(FileExtensionTest, TheDescriptorsPositionDoesNotMatter) {
+  const int file = ::open(folder_.write("a", "contents").c_str(), O_RDONLY | O_CLOEXEC);
+  const Descriptor kept = ownDescriptor(::dup(file));
+  const auto taken = access(file);
+  ASSERT_EQ(::lseek(kept.get(), 5, SEEK_SET), 5);
+  EXPECT_EQ(contents(*taken), "contents");
+  EXPECT_EQ(::lseek(kept.get(), 0, SEEK_CUR), 5);
+}
+
+TEST_F(FileExtensionTest, AFileOverTheLimitIsNotRead) {
+  const auto file = access(folder_.write("a", "12345678"));
+  EXPECT_EQ(contents(*file, 8), "12345678");
+  EXPECT_EQ(contents(*file, 7), "(too large)");
+  const std::string sparse = folder_.write("sparse", "");
+  ASSERT_EQ(::truncate(sparse.c_str(), off_t{1} << 40), 0);
+  EXPECT_EQ(contents(*access(sparse)), "(too large)");
+}
+
+// The kernel's own files say that they are regular and empty, whatever a reader would get.
+TEST_F(FileExtensionTest, FilesOfTheKernelAreEmpty) {
+  const auto file = access("/proc/self/environ");
+  EXPECT_TRUE(file->isReadableRegularFile());
+  EXPECT_EQ(contents(*file), "");
+}
+
+TEST_F(FileExtensionTest, AFileThatGrowsIsReadAsLongAsItWas) {
+  constexpr size_t kStart = 100000;
+  const std::string path = folder_.write("log", std::string(kStart, 'x'));
+  const auto file = access(path);
+  std::atomic<bool> stop{false}, grown{false};
+  std::jthread writer([&] {
+    const Descriptor out = ownDescriptor(::open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC));
+    const std::string more(4096, 'x');
+    for (size_t size = kStart; !stop && size < kPlenty - more.size(); size += more.size()) {
+      EXPECT_EQ(::write(out.get(), more.data(), more.size()), static_cast<ssize_t>(more.size()));
+      grown = true;
+    }
+  });
+  EXPECT_TRUE(eventually([&] { return grown.load(); }));
+  const std::string read = contents(*file);
+  stop = true;
+  EXPECT_GT(read.size(), kStart);
+  EXPECT_EQ(read, std::string(read.size(), 'x'));
+}
+
+TEST_F(FileExtensionTest, AFileThatShrinksIsReadAsFarAsItIsThere) {
+  constexpr size_t kStart = 900000;
+  const std::string path = folder_.write("log", std::string(kStart, 'x'));
+  const auto file = access(path);
+  std::atomic<bool> stop{false};
+  std::jthread writer([&] {
+    while (!stop) {
+      EXPECT_EQ(::truncate(path.c_str(), 10), 0);
+      EXPECT_EQ(::truncate(path.c_str(), kStart), 0);
+    }
+  });
+  bool shrunk = false;
+  for (int round = 0; round < 200; ++round) {
+    const std::string read = contents(*file);
+    ASSERT_LE(read.size(), kStart);
+    ASSERT_GE(read.size(), 10u);
+    ASSERT_EQ(read.substr(0, 10), "xxxxxxxxxx");
+    shrunk = shrunk || read.size() < kStart;
+  }
+  stop = true;
+  EXPECT_TRUE(shrunk);
+}
+
+TEST_F(FileExtensionTest, WithoutABrokerNothingIsRemovedAndItIsCounted) {
+  LinuxFileExtensions alone(nullptr, log_, counters_);
+  auto given = extension(::open(folder_.write("a", "1").c_str(), O_RDONLY | O_CLOEXEC));
+  const auto file = alone.consume("token", given);
+  ASSERT_NE(file, nullptr);
+  EXPECT_EQ(contents(*file), "1");
+  EXPECT_FALSE(file->remove("a"));
+  EXPECT_TRUE(exists("a"));
+  EXPECT_EQ(counters_.value(Reason::fileNotRemoved), 1u);
+}
+
+}  // namespace
+}  // namespace kyt
