@@ -104,10 +104,13 @@ bool takeExtension(const std::vector<uint32_t>& indexes, const Peer& peer,
   if (indexes.empty()) return true;
   if (indexes.size() != 2 || indexes[0] == indexes[1]) return false;
   if (indexes[0] >= descriptors.size() || indexes[1] >= descriptors.size()) return false;
-  PeerCredentials client = peer.stream.peer();
-  extension = FileExtension{std::move(descriptors[indexes[0]]),
-                            std::move(descriptors[indexes[1]]),
-                            {client.uid, client.gid, std::move(client.groups)}};
+  PeerIdentity client;
+  if (peer.stream != nullptr) {
+    PeerCredentials known = peer.stream->peer();
+    client = {known.uid, known.gid, std::move(known.groups)};
+  }
+  extension = FileExtension{std::move(descriptors[indexes[0]]), std::move(descriptors[indexes[1]]),
+                            std::move(client)};
   return true;
 }
 

@@ -35,7 +35,7 @@ class ClientSessionDispatcher {
     const std::shared_ptr<ConnectionOutput>& output;
     std::span<Descriptor> descriptors;  // those that came with the message; the session may take them
     uint64_t connectionNumber;          // the unique name is ":1.N"
-    Stream& stream;                     // asked who the client is when a call needs its rights
+    Stream* stream = nullptr;           // asked who the client is when a call needs its rights; none: nobody
   };
   // Null, or why the message is malformed (then the connection must end and nothing was called or answered).
   [[nodiscard]] const char* handle(const Message& message, const Peer& peer) const;

@@ -208,7 +208,7 @@ DBusConnection::Step DBusConnection::handleMessage(std::span<const std::byte> by
                                                               .output = output_,
                                                               .descriptors = taken,
                                                               .connectionNumber = number_,
-                                                              .stream = *stream_});
+                                                              .stream = stream_.get()});
   return problem == nullptr ? Step::more : breakOff(Reason::malformedMessage, problem);
 }
 
