@@ -31,7 +31,8 @@ void JournalPowerLog::registeredEvent(uint32_t agent, std::string_view event, co
   iovec parts[std::size(fields)];
   for (size_t i = 0; i < std::size(fields); ++i)
     parts[i] = {const_cast<char*>(fields[i].data()), fields[i].size()};
-  if (systemd->journalSend(parts, static_cast<int>(std::size(fields))) < 0) counters_.add(Reason::powerLogUnavailable);
+  if (systemd->journalSend(parts, static_cast<int>(std::size(fields))) < 0)
+    counters_.add(Reason::powerLogUnavailable);
 }
 
 }  // namespace kyt
