@@ -29,7 +29,10 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/LinuxUDPSocket.h"
+#include "platform/linux/system/DlopenPluginBundles.h"
+#include "platform/linux/system/JournalPowerLog.h"
 #include "platform/linux/system/LinuxDeviceProperties.h"
+#include "platform/linux/system/LinuxFileExtensions.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/TomlUserDefaults.h"
 #include "platform/linux/url/CurlUrlSession.h"
@@ -77,10 +80,13 @@ struct Machine {
   CurlURLSessionFactory urlSessions{CurlURLSessionOptions{}, log, counters};
   LinuxUDPSocketFactory udpSockets;
   NoBundle bundle;
-  Platform platform{limits,   counters,     log,           clock,        *reactor,
-                    *reactor, workers,      random,        userDefaults, deviceProperties,
-                    consent,  cryptography, propertyLists, json,         deflate,
-                    memory,   urlSessions,  udpSockets,    bundle,       bundle};
+  LinuxFileExtensions fileExtensions{nullptr, log, counters};
+  DlopenPluginBundles pluginBundles{"/nonexistent", log};
+  JournalPowerLog powerLog{counters};
+  Platform platform{
+      limits,       counters,         log,     clock,        *reactor,       *reactor,      workers, random,
+      userDefaults, deviceProperties, consent, cryptography, propertyLists,  json,          deflate, memory,
+      urlSessions,  udpSockets,       bundle,  bundle,       fileExtensions, pluginBundles, powerLog};
   ~Machine() {
     workers.shutDown();
     if (reactor) reactor->stop();
