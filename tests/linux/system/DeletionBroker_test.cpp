@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -222,8 +223,8 @@ TEST(GiveUpTakingUsers, IsForGood) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to have something to give up";
   EXPECT_EQ(inChildProcess([]() -> std::string {
               DeletionBroker::giveUpTakingUsers();
-              if (::setresuid(kOther, kOther, kOther) == 0) return "became another user";
-              if (::setresgid(kOther, kOther, kOther) == 0) return "took another group";
+              if (::syscall(SYS_setresuid, kOther, kOther, kOther) == 0) return "became another user";
+              if (::syscall(SYS_setresgid, kOther, kOther, kOther) == 0) return "took another group";
               return "";
             }),
             "");
