@@ -46,6 +46,8 @@ const char* reasonName(Reason reason) {
       return "post-refused";
     case Reason::waitingRequestDisplaced:
       return "waiting-request-displaced";
+    case Reason::outstandingBytesExceeded:
+      return "outstanding-bytes-exceeded";
     case Reason::workersExhausted:
       return "workers-exhausted";
     case Reason::sharedDataRefused:

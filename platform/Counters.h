@@ -30,11 +30,12 @@ enum class Reason : uint8_t {
   batchDiscarded,        // records discarded with a batch whose back end is not enabled
   batchedEventFiltered,  // records rejected by the lists at a flush
   postWithoutURL,
-  postWithoutPoster,        // a request whose session was gone: nothing was sent
-  postFailed,               // a request ended with a transport error; its events are lost
-  postRefused,              // a server answered 4xx or 5xx
-  waitingRequestDisplaced,  // a request dropped while waiting for connectivity
-  workersExhausted,         // work waited because all workers were in use
+  postWithoutPoster,         // a request whose session was gone: nothing was sent
+  postFailed,                // a request ended with a transport error; its events are lost
+  postRefused,               // a server answered 4xx or 5xx
+  waitingRequestDisplaced,   // a request dropped while waiting for connectivity
+  outstandingBytesExceeded,  // a request refused since too much of its session was not answered yet
+  workersExhausted,          // work waited because all workers were in use
   sharedDataRefused,
   hierarchyTokenRefused,
   uploadTooLarge,

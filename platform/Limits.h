@@ -26,8 +26,11 @@ struct Limits {
   static constexpr size_t maxHTTPReplyBytes = 4u << 20;  // a server cannot fill the memory
   static constexpr size_t maxPropertyListTags = 131072;  // each takes up to 128 bytes while it is read
   static constexpr size_t maxWaitingBytes =
-      16u << 20;                             // request bodies waiting for connectivity, each URL session
-  static constexpr size_t maxWorkers = 512;  // threads
+      16u << 20;  // request bodies waiting for connectivity, each URL session
+  // Requests started and not completed, each URL session: a server that answers slowly, or never, cannot make a
+  // fast client fill the memory.
+  static constexpr size_t maxOutstandingBytes = 64u << 20;
+  static constexpr size_t maxWorkers = 512;           // threads
   static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
   static constexpr double handshakeSeconds = 30;
   static constexpr size_t maxDescriptorsPerMessage = 16;

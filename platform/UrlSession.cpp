@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cctype>
 
+#include "platform/Limits.h"
+
 namespace kyt {
 
 std::optional<std::string_view> URLResponse::header(std::string_view name) const {
@@ -12,6 +14,21 @@ std::optional<std::string_view> URLResponse::header(std::string_view name) const
   for (const auto& [key, value] : headers)
     if (std::equal(key.begin(), key.end(), name.begin(), name.end(), sameLetter)) return value;
   return std::nullopt;
+}
+
+size_t OutstandingBytes::of(const URLRequest& request) {
+  constexpr size_t kRequestCost = 12288;  // measured: what libcurl keeps, however small the request is
+  size_t bytes = kRequestCost + request.url.size() + request.body.size();
+  for (const auto& [name, value] : request.headers) bytes += name.size() + value.size();
+  return std::min(bytes, Limits::maxOutstandingBytes / 2);
+}
+
+bool OutstandingBytes::take(size_t bytes) {
+  size_t before = bytes_.load(std::memory_order_relaxed);
+  do {
+    if (before + bytes > Limits::maxOutstandingBytes) return false;
+  } while (!bytes_.compare_exchange_weak(before, before + bytes, std::memory_order_relaxed));
+  return true;
 }
 
 }  // namespace kyt

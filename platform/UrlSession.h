@@ -7,6 +7,7 @@
 // a reply body over `Limits::maxHTTPReplyBytes` is an error.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <optional>
 #include <string>
@@ -21,10 +22,11 @@
 
 namespace kyt {
 
-// The domain of transport failures; the code is libcurl's (CURLcode), or one of the two below.
+// The domain of transport failures; the code is libcurl's (CURLcode), or one of those below.
 inline constexpr char kKYTURLErrorDomain[] = "KYTURLErrorDomain";
-inline constexpr int32_t kURLErrorCancelled = -999;        // the session was cancelled (shut-down)
-inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;  // displaced while waiting for connectivity
+inline constexpr int32_t kURLErrorCancelled = -999;            // the session was cancelled (shut-down)
+inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;      // displaced while waiting for connectivity
+inline constexpr int32_t kURLErrorOutstandingTooMuch = -1002;  // see URLSession::start
 
 struct URLRequest {
   std::string method = "GET";
@@ -54,6 +56,21 @@ struct URLSessionConfiguration {
       false;  // a request that cannot leave (no route, no resolver) waits for the network
 };
 
+// What the requests of one session that have not completed count towards `Limits::maxOutstandingBytes`, for those who
+// implement the port. Any thread.
+class OutstandingBytes {
+ public:
+  // Header lines, body, and what keeping any request costs. One counts at most half of the limit, so that a large
+  // upload, which has a limit of its own, neither fails for its size nor shuts out what is posted meanwhile.
+  [[nodiscard]] static size_t of(const URLRequest& request);
+  // Whether there was room; then it counts until it is given back.
+  [[nodiscard]] bool take(size_t bytes);
+  void giveBack(size_t bytes) { bytes_.fetch_sub(bytes, std::memory_order_relaxed); }
+
+ private:
+  std::atomic<size_t> bytes_{0};
+};
+
 // A handle to a request that was started; dropping it changes nothing.
 class URLTask {
  public:
@@ -65,13 +82,16 @@ class URLTask {
 class URLSession {
  public:
   virtual ~URLSession() = default;
+  // A request that would make the session's outstanding ones count more than `Limits::maxOutstandingBytes` fails at
+  // once with kURLErrorOutstandingTooMuch, and those before it go on.
   virtual std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) = 0;
   // Requests already started still complete and call their completions; later ones fail with kURLErrorCancelled.
   virtual void finishTasksAndInvalidate() = 0;
 };
 
 struct URLFigures {
-  uint64_t started = 0, completed = 0, failed = 0, waiting = 0, waitingBytes = 0, droppedWhileWaiting = 0;
+  uint64_t started = 0, completed = 0, failed = 0, waiting = 0, waitingBytes = 0, droppedWhileWaiting = 0,
+           refused = 0;  // too much was outstanding; they count as failed too
 };
 
 class URLSessionFactory {

@@ -16,6 +16,8 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     size_t session = 0;
     URLCompletion completion;
     std::shared_ptr<SerialQueue> queue;
+    std::shared_ptr<OutstandingBytes> outstanding;
+    size_t charge = 0;
     bool open = true;
   };
 
@@ -35,9 +37,13 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
   size_t start(Entry entry, bool refused) {
     Responder responder;
     size_t index = 0;
+    const size_t charge = OutstandingBytes::of(entry.request);
+    const bool tooMuch = !refused && !entry.outstanding->take(charge);
+    if (!refused && !tooMuch) entry.charge = charge;
     {
       std::lock_guard lock(mutex_);
-      refused = refused || cancelled_;
+      refused = refused || cancelled_ || tooMuch;
+      if (tooMuch) ++figures_.refused;
       index = entries_.size();
       if (!refused) responder = responder_;
       entries_.push_back(std::make_unique<Entry>(std::move(entry)));
@@ -45,7 +51,9 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
       ++open_;
       grew_.notify_all();
     }
-    if (refused) {
+    if (tooMuch) {
+      fail(index, kURLErrorOutstandingTooMuch, "Too much was outstanding");
+    } else if (refused) {
       cancel(index);
     } else if (responder) {
       if (std::optional<Reply> reply = responder(request(index))) answer(index, std::move(*reply));
@@ -61,6 +69,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
       Entry& entry = *entries_.at(index);
       if (!entry.open) return false;
       entry.open = false;
+      entry.outstanding->giveBack(entry.charge);
       --open_;
       ++(reply.error ? figures_.failed : figures_.completed);
       completion = std::move(entry.completion);
@@ -83,9 +92,11 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     return true;
   }
 
-  void cancel(size_t index) {
+  void cancel(size_t index) { fail(index, kURLErrorCancelled, "cancelled"); }
+
+  void fail(size_t index, int32_t code, const char* description) {
     Reply reply;
-    reply.error = Error{kKYTURLErrorDomain, kURLErrorCancelled, "cancelled"};
+    reply.error = Error{kKYTURLErrorDomain, code, description};
     answer(index, std::move(reply));
   }
 
@@ -151,6 +162,7 @@ class FakeURLSession final : public URLSession {
     entry.session = number_;
     entry.completion = std::move(completion);
     entry.queue = queue_;
+    entry.outstanding = outstanding_;
     const size_t index = state_->start(std::move(entry), invalidated_);
     return std::make_shared<FakeURLTask>(state_, index);
   }
@@ -163,6 +175,7 @@ class FakeURLSession final : public URLSession {
   std::shared_ptr<FakeURLSessionFactory::State> state_;
   URLSessionConfiguration configuration_;
   std::shared_ptr<SerialQueue> queue_;
+  std::shared_ptr<OutstandingBytes> outstanding_ = std::make_shared<OutstandingBytes>();
   size_t number_;
   std::atomic<bool> invalidated_{false};
 };

@@ -11,6 +11,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <vector>
@@ -50,6 +51,13 @@ class DaemonProcess {
 
   [[nodiscard]] const TemporaryFolder& root() const { return root_; }
   [[nodiscard]] std::string socketPath() const { return root_ / "run/kytreportingd/com.vantu.kytreportingd"; }
+  // Memory that the process holds for itself alone; 0 when it is not running.
+  [[nodiscard]] long anonymousKiB() const {
+    std::ifstream status("/proc/" + std::to_string(child_) + "/status");
+    for (std::string line; std::getline(status, line);)
+      if (line.starts_with("RssAnon:")) return std::stol(line.substr(8));
+    return 0;
+  }
   [[nodiscard]] std::string log() const { return root_.read("log"); }
   [[nodiscard]] bool logged(std::string_view text) const { return log().find(text) != std::string::npos; }
   void writeSettings(const std::string& text) { root_.write("etc/kytreportingd/kytreportingd.toml", text); }

@@ -4,12 +4,14 @@
 
 #include <atomic>
 #include <functional>
+#include <random>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/TestClient.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
@@ -247,6 +249,55 @@ TEST_F(HostileServer, APostThatIsAnsweredForeverDoesNotHoldUpTheEnd) {
       << "half a second of grace, then some";
   EXPECT_TRUE(daemon_.logged("requests that have not been answered in time")) << daemon_.log();
   ASSERT_TRUE(daemon_.startAndWait());
+}
+
+// Text that does not compress well.
+std::string noise(size_t bytes, uint32_t seed) {
+  std::mt19937 random(seed);
+  std::string text(bytes, 0);
+  for (char& c : text) c = static_cast<char>(' ' + 2 + random() % 64);
+  return text;
+}
+
+TEST_F(HostileServer, PostsThatAreNeverAnsweredDoNotFillTheMemory) {
+  serve(signedBag(goodBag(), propertyLists_));
+  TestHTTPServer::Reply never;
+  never.behaviour = Behaviour::hold;
+  posts_.setReply(never);
+  TestClient client(daemon_.socketPath(), kTorvel, "a");
+  ASSERT_EQ(client.configure(), "live: httppost qrs");
+  // A hundred and twenty megabytes of bodies for one session, and ten thousand small ones for another.
+  const std::string text = noise(800000, 1);
+  for (int i = 0; i < 120; ++i) {
+    EXPECT_TRUE(client.send(9, 1, Dictionary{{"text", text}}, 1));
+    ASSERT_NE(client.displayURL(), "no answer");  // the client's own queue has a limit too
+  }
+  const auto refusals = [&] {
+    return daemon_.logged(
+        "CurlURLSession(start): more than 67108864 bytes of requests are outstanding, refusing further ones");
+  };
+  ASSERT_TRUE(eventually(refusals)) << daemon_.log();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"text", text}}));
+  EXPECT_EQ(client.flush(), "error: Too much was outstanding");
+  const long large = daemon_.anonymousKiB();
+  TestClient other(daemon_.socketPath(), kTorvel, "a");
+  ASSERT_EQ(other.configure(), "live: httppost qrs");
+  for (int i = 0; i < 10000; ++i) {
+    ASSERT_TRUE(other.send(9, 1, Dictionary{{"k", i}}, 1));
+    if (i % 100 == 99) {
+      ASSERT_NE(other.displayURL(), "no answer");
+    }
+  }
+  const long both = daemon_.anonymousKiB();
+  if (!kSanitized) {
+    EXPECT_LT(large, 128 * 1024);
+    EXPECT_LT(both - large, 96 * 1024);
+  }
+  posts_.setReply({});
+  posts_.release();
+  EXPECT_TRUE(eventually([&] {
+    return other.send(9, 1, Dictionary{{"k", 1}}) && other.flush() == "flushed";
+  })) << "there is room again";
 }
 
 TEST_F(HostileServer, AHangingStorebagDoesNotHoldUpTheEndOfSessionsThatWaitForIt) {

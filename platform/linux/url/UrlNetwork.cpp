@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <system_error>
 
+#include "platform/Limits.h"
 #include "platform/linux/base/CodePages.h"
 #include "platform/linux/base/Threads.h"
 
@@ -133,6 +134,7 @@ URLFigures URLNetwork::figures() const {
   figures.waiting = waiting_.load();
   figures.waitingBytes = waitingBodyBytes_.load();
   figures.droppedWhileWaiting = displaced_.load();
+  figures.refused = refused_.load();
   return figures;
 }
 
@@ -210,8 +212,10 @@ void URLNetwork::begin(std::shared_ptr<URLTransfer> transfer) {
     sessions_.append(session);
   }
   begun.started = now_;
-  if (begun.refused || cancelled_.load()) {
+  if (begun.refusal == URLTransfer::Refusal::invalidated || cancelled_.load()) {
     fail(begun, kURLErrorCancelled, "The URL session was invalidated");
+  } else if (begun.refusal == URLTransfer::Refusal::tooMuch) {
+    refuse(begun);
   } else if (!namesItsScheme(begun.request.url)) {
     fail(begun, CURLE_UNSUPPORTED_PROTOCOL, "The address begins neither with https:// nor with http://");
   } else if (!curl_ && !loadCurl()) {
@@ -232,6 +236,16 @@ bool URLNetwork::loadCurl() {
   curl_ = std::get<CurlLibrary>(loaded);
   static_cast<void>(giveBackCodePages());
   return true;
+}
+
+void URLNetwork::refuse(URLTransfer& transfer) {
+  refused_.fetch_add(1, std::memory_order_relaxed);
+  if (counters_.addAndMayLog(Reason::outstandingBytesExceeded, now_)) {
+    log_.error(
+        "CurlURLSession(start): more than %zu bytes of requests are outstanding, refusing further ones",
+        Limits::maxOutstandingBytes);
+  }
+  fail(transfer, kURLErrorOutstandingTooMuch, "Too much was outstanding");
 }
 
 void URLNetwork::activate(URLTransfer& transfer) {
@@ -312,6 +326,8 @@ void URLNetwork::finish(URLTransfer& transfer) {
   URLSessionState& session = *transfer.session;
   transfer.phase = URLTransfer::Phase::done;
   session.transfers.remove(transfer);
+  session.outstanding.giveBack(std::exchange(transfer.outstandingCharge, 0));
+  transfer.request.body = {};
   if (!session.queue) session.queue = SerialQueue::create("URL session", *workers_);
   const std::shared_ptr<SerialQueue> queue = session.queue;
   const std::shared_ptr<URLTransfer> delivered = std::move(transfer.self);

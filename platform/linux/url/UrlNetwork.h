@@ -99,6 +99,7 @@ class URLNetwork {
   void takeCommands();
   void begin(std::shared_ptr<URLTransfer> transfer);
   [[nodiscard]] bool loadCurl();
+  void refuse(URLTransfer& transfer);
   void activate(URLTransfer& transfer);
   void armDeadline(URLTransfer& transfer);
   void withdraw(URLTransfer& transfer);  // from its pool, or from those that wait
@@ -128,7 +129,7 @@ class URLNetwork {
   std::atomic<size_t> outstanding_{0};
   std::atomic<bool> cancelled_{false};
   std::atomic<uint64_t> started_{0}, completed_{0}, failed_{0}, waiting_{0}, waitingBodyBytes_{0},
-      displaced_{0};
+      displaced_{0}, refused_{0};
   int epoll_ = -1, wake_ = -1;
 
   Mutex mutex_;

@@ -27,6 +27,7 @@ struct URLSessionState {
   // Self-synchronised.
   std::atomic<bool> used{false};  // a request was started: the network thread knows this session
   std::atomic<bool> invalidated{false};
+  OutstandingBytes outstanding;
 
   // The network thread's.
   std::shared_ptr<URLSessionState> self;  // while listed: connections end on the network thread alone

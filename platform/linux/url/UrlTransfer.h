@@ -46,7 +46,8 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   const std::shared_ptr<URLSessionState> session;
   URLRequest request;
   Phase phase = Phase::submitted;
-  bool refused = false;  // started too late: the session was invalidated
+  // Started too late, the session was invalidated; or while too much of it was outstanding.
+  enum class Refusal : uint8_t { none, invalidated, tooMuch } refusal = Refusal::none;
   uint8_t immediateRetries = 0;
   bool onlyCellularRoutes = false;    // why the last attempt opened no connection
   bool replyTooLong = false;          // … or ended
@@ -54,6 +55,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   std::shared_ptr<URLTransfer> self;  // keeps it alive while the network thread has it
   CURL* handle = nullptr;             // while active
   size_t waitingCharge = 0;           // while waiting
+  size_t outstandingCharge = 0;       // until its result is set
   MonotonicTime started, lastProgress;
   Deadline deadline;
   std::vector<sockaddr_storage> addresses;  // that the last attempt tried to connect to

@@ -199,6 +199,23 @@ TEST_F(CurlURLSession, RunsCompletionsOnWorkersOfItsOwnOneAfterTheOther) {
   EXPECT_EQ(done, 50);
 }
 
+TEST_F(CurlURLSession, CountsRefusedRequestsAndSaysSoOnce) {
+  server_.setReply(reply(Behaviour::hold));
+  auto urls = session();
+  const std::string half(Limits::maxOutstandingBytes / 2, 'x');
+  Outcome kept[2], refused[2];
+  for (Outcome& outcome : kept) urls->start(post(server_.url("/"), half), outcome.completion());
+  for (Outcome& outcome : refused) {
+    urls->start(post(server_.url("/"), "x"), outcome.completion());
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.errorCode(), kURLErrorOutstandingTooMuch);
+  }
+  EXPECT_EQ(counters_.value(Reason::outstandingBytesExceeded), 2u);
+  EXPECT_EQ(sink_.count("CurlURLSession(start): more than 67108864 bytes of requests are outstanding"), 1u);
+  EXPECT_EQ(factory().figures().failed, 2u);
+  for (const Outcome& outcome : kept) EXPECT_FALSE(outcome.isDone());
+}
+
 // The signals that a thread of this process blocks, by its name; nothing when there is no such thread.
 std::optional<uint64_t> signalsBlockedBy(const std::string& threadName) {
   for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {

@@ -1,5 +1,6 @@
 // What every implementation of the URL session port promises, tested on the real one and on the one in
 // memory.
+#include "platform/Limits.h"
 #include "platform/WorkerPool.h"
 #include "platform/fake/FakeUrlSession.h"
 #include "tests/linux/url/CurlUrlSessionFixture.h"
@@ -146,6 +147,49 @@ TYPED_TEST(URLSessionContract, CancelsAllForGood) {
   EXPECT_EQ(after.errorCode(), kURLErrorCancelled);
   EXPECT_TRUE(this->drained());
   EXPECT_EQ(this->factory().figures().failed, 2u);
+}
+
+TYPED_TEST(URLSessionContract, RefusesWhatWouldMakeTooMuchOutstanding) {
+  auto urls = this->factory().create({}), other = this->factory().create({});
+  const std::string piece(Limits::maxOutstandingBytes / 16, 'x');
+  std::vector<Outcome> admitted(15);  // with what each request costs one more is too much
+  for (Outcome& outcome : admitted) urls->start(this->request(piece), outcome.completion());
+  Outcome refused, small, elsewhere;
+  urls->start(this->request(piece), refused.completion());
+  ASSERT_TRUE(refused.wait());
+  EXPECT_EQ(refused.errorCode(), kURLErrorOutstandingTooMuch);
+  EXPECT_EQ(refused.error()->domain, kKYTURLErrorDomain);
+  EXPECT_EQ(this->factory().figures().refused, 1u);
+  urls->start(this->request("small"), small.completion());
+  other->start(this->request("elsewhere"), elsewhere.completion());
+  this->implementation_.answerAll();
+  for (Outcome& outcome : admitted) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.errorText(), "");
+  }
+  ASSERT_TRUE(small.wait() && elsewhere.wait());
+  EXPECT_EQ(small.body(), "small");
+  EXPECT_EQ(elsewhere.body(), "elsewhere");
+  EXPECT_TRUE(this->drained());
+  std::vector<Outcome> again(15);  // there is room again
+  for (Outcome& outcome : again) urls->start(this->request(piece), outcome.completion());
+  for (Outcome& outcome : again) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.errorText(), "");
+  }
+  EXPECT_EQ(this->factory().figures().refused, 1u);
+}
+
+TYPED_TEST(URLSessionContract, ARequestOfAnySizeLeavesRoomForSmallOnes) {
+  auto urls = this->factory().create({});
+  Outcome large, small;
+  urls->start(this->request(std::string(Limits::maxOutstandingBytes + 1, 'x')), large.completion());
+  urls->start(this->request("small"), small.completion());
+  this->factory().cancelAll();
+  ASSERT_TRUE(large.wait() && small.wait());
+  EXPECT_EQ(large.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(small.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(this->factory().figures().refused, 0u);
 }
 
 TYPED_TEST(URLSessionContract, StartsARequestFromACompletion) {
