@@ -11,6 +11,10 @@ struct kyt_dictionary {
   kyt::Dictionary value;
 };
 
+struct kyt_array {
+  kyt::Array value;
+};
+
 struct kyt_session {
   std::unique_ptr<kyt::KYTReporting> reporting;
 };
@@ -68,9 +72,55 @@ KYTReporting::StatesCompletion statesCompletion(kyt_states_callback callback, vo
       };
 }
 
+KYTReporting::SuccessCompletion successCompletion(kyt_success_callback callback, void* context) {
+  if (callback == nullptr) return nullptr;
+  return [callback, context](bool success, const std::optional<kyt::Error>& error) {
+    callback(success ? 1 : 0, error ? error->localizedDescription.c_str() : nullptr, context);
+  };
+}
+
+KYTReporting::ObjectCompletion objectCompletion(kyt_text_callback callback, void* context) {
+  if (callback == nullptr) return nullptr;
+  return [callback, context](const Value& result, const std::optional<kyt::Error>& error) {
+    const std::string text = kyt::description(result);
+    callback(result.isNull() ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr,
+             context);
+  };
+}
+
+void append(kyt_array* array, Value value) {
+  if (array != nullptr) array->value.append(std::move(value));
+}
+
 }  // namespace
 
 extern "C" {
+
+kyt_array* kyt_array_new(void) {
+  return new (std::nothrow) kyt_array;
+}
+void kyt_array_free(kyt_array* array) {
+  delete array;
+}
+void kyt_array_append_string(kyt_array* array, const char* value) {
+  append(array, value != nullptr ? Value(value) : Value());
+}
+void kyt_array_append_int(kyt_array* array, int64_t value) {
+  append(array, value);
+}
+void kyt_array_append_double(kyt_array* array, double value) {
+  append(array, value);
+}
+void kyt_array_append_data(kyt_array* array, const void* bytes, size_t length) {
+  if (bytes != nullptr || length == 0)
+    append(array, kyt::Data(std::string_view(static_cast<const char*>(bytes), length)));
+}
+void kyt_array_append_dictionary(kyt_array* array, const kyt_dictionary* value) {
+  if (value != nullptr) append(array, value->value);
+}
+size_t kyt_array_count(const kyt_array* array) {
+  return array != nullptr ? array->value.size() : 0;
+}
 
 kyt_dictionary* kyt_dictionary_new(void) {
   return new (std::nothrow) kyt_dictionary;
@@ -150,17 +200,32 @@ int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type, con
              ? 1
              : 0;
 }
-void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* context) {
-  if (session == nullptr) return;
-  if (callback == nullptr) {
-    session->reporting->flush();
-    return;
-  }
-  session->reporting->flush([callback, context](Value result, std::optional<kyt::Error> error) {
-    const std::string text = kyt::description(result);
-    callback(result.isNull() ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr,
-             context);
+void kyt_session_send_with_reply(kyt_session* session, uint16_t category, uint16_t type,
+                                 const kyt_dictionary* payload, uint32_t flag, kyt_text_callback callback,
+                                 void* context) {
+  if (session != nullptr)
+    session->reporting->sendMessage(category, type, payload != nullptr ? payload->value : Dictionary(), flag,
+                                    objectCompletion(callback, context));
+}
+void kyt_session_fetch_display_url(kyt_session* session, kyt_text_callback callback, void* context) {
+  if (session == nullptr || callback == nullptr) return;
+  session->reporting->fetchDisplayURL([callback, context](const std::string& text,
+                                                          const std::optional<kyt::Error>& error) {
+    callback(error ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr, context);
   });
+}
+void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* context) {
+  if (session != nullptr) session->reporting->flush(objectCompletion(callback, context));
+}
+void kyt_session_upload_file(kyt_session* session, const char* path, kyt_success_callback callback,
+                             void* context) {
+  if (session != nullptr && path != nullptr)
+    session->reporting->uploadFile(path, successCompletion(callback, context));
+}
+void kyt_session_upload_log_data(kyt_session* session, const kyt_array* log_data,
+                                 kyt_success_callback callback, void* context) {
+  if (session != nullptr && log_data != nullptr)
+    session->reporting->uploadLogData(log_data->value, successCompletion(callback, context));
 }
 void kyt_session_update_shared_data(kyt_session* session, const kyt_dictionary* entries) {
   if (session != nullptr && entries != nullptr) session->reporting->updateSharedData(entries->value);

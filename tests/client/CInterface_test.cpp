@@ -61,6 +61,73 @@ TEST(CInterface, RunsAWholeSession) {
                                                       "Send 1 3 -", "DigestKey abc 0", "Flush", "Finish"}));
 }
 
+TEST(CInterface, AsksForAnswersUploadsAndLogData) {
+  TemporaryFolder folder;
+  const std::string socket = folder / "socket";
+  TestDaemon daemon(socket);
+  ASSERT_TRUE(daemon.start());
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = socket.c_str();
+  kyt_session* session = kyt_session_open(&options);
+
+  const kyt_text_callback keepText = [](const char* text, const char* error, void* context) {
+    static_cast<std::promise<std::string>*>(context)->set_value(error != nullptr  ? error
+                                                                : text != nullptr ? text
+                                                                                  : "");
+  };
+  std::promise<std::string> posted, url;
+  kyt_session_send_with_reply(session, 1, 2, nullptr, 0, keepText, &posted);
+  EXPECT_EQ(posted.get_future().get(), "posted");
+  kyt_session_fetch_display_url(session, keepText, &url);
+  EXPECT_EQ(url.get_future().get(), "https://display");
+
+  const kyt_success_callback keepSuccess = [](int success, const char*, void* context) {
+    static_cast<std::promise<int>*>(context)->set_value(success);
+  };
+  std::promise<int> uploaded, missing, logged;
+  kyt_session_upload_file(session, folder.write("report.log", "content").c_str(), keepSuccess, &uploaded);
+  EXPECT_EQ(uploaded.get_future().get(), 1);
+  kyt_session_upload_file(session, (folder / "missing").c_str(), keepSuccess, &missing);
+  EXPECT_EQ(missing.get_future().get(), 0);
+  kyt_array* entries = kyt_array_new();
+  kyt_array_append_string(entries, "line");
+  kyt_array_append_int(entries, 2);
+  kyt_array_append_double(entries, 0.5);
+  kyt_array_append_data(entries, "ab", 2);
+  EXPECT_EQ(kyt_array_count(entries), 4u);
+  kyt_session_upload_log_data(session, entries, keepSuccess, &logged);
+  kyt_array_free(entries);
+  EXPECT_EQ(logged.get_future().get(), 0);
+  EXPECT_EQ(daemon.count("LogData 4"), 1u);
+  EXPECT_EQ(daemon.count("Upload file://"), 1u);
+  kyt_session_close(session);
+}
+
+TEST(CInterface, ReceivesAggregatedMessages) {
+  TemporaryFolder folder;
+  const std::string socket = folder / "socket";
+  TestDaemon daemon(socket);
+  ASSERT_TRUE(daemon.start());
+  std::promise<std::string> received;
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = socket.c_str();
+  options.aggregation = [](const kyt_dictionary* info, double timestamp, uint16_t category, uint16_t type,
+                           const kyt_dictionary* payload, void* context) {
+    static_cast<std::promise<std::string>*>(context)->set_value(
+        std::to_string(kyt_dictionary_get_int(info, "SessionID", 0)) + " " + std::to_string(timestamp) + " " +
+        std::to_string(category) + " " + std::to_string(type) + " " +
+        kyt_dictionary_get_string(payload, "k"));
+  };
+  options.aggregation_context = &received;
+  kyt_session* session = kyt_session_open(&options);
+  ASSERT_TRUE(eventually([&] { return daemon.count("SetSessionInfo") == 1; }));
+  daemon.sendToClient(Dictionary{{"SessionID", 7}}, 12.5, 3, 4, Dictionary{{"k", "v"}});
+  EXPECT_EQ(received.get_future().get(), "7 12.500000 3 4 v");
+  kyt_session_close(session);
+}
+
 TEST(CInterface, ReadsBackWhatWasSetInADictionary) {
   kyt_dictionary* dictionary = kyt_dictionary_new();
   kyt_dictionary_set_string(dictionary, "s", "text");

@@ -51,9 +51,22 @@ KYT_API const char* kyt_dictionary_get_string(const kyt_dictionary* dictionary, 
 KYT_API int64_t kyt_dictionary_get_int(const kyt_dictionary* dictionary, const char* key, int64_t otherwise);
 KYT_API double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* key, double otherwise);
 
+/* Arrays: what uploaded log data is made of. */
+typedef struct kyt_array kyt_array;
+KYT_API kyt_array* kyt_array_new(void);
+KYT_API void kyt_array_free(kyt_array* array);
+KYT_API void kyt_array_append_string(kyt_array* array, const char* value);
+KYT_API void kyt_array_append_int(kyt_array* array, int64_t value);
+KYT_API void kyt_array_append_double(kyt_array* array, double value);
+KYT_API void kyt_array_append_data(kyt_array* array, const void* bytes, size_t length);
+/* The value stays the caller's; later changes of it do not reach `array`. */
+KYT_API void kyt_array_append_dictionary(kyt_array* array, const kyt_dictionary* value);
+KYT_API size_t kyt_array_count(const kyt_array* array);
+
 /* `error` is null when all went well; otherwise its text. Arguments are valid during the call only. */
 typedef void (*kyt_states_callback)(const char* const* names, size_t count, int has_storebag,
                                     const char* error, void* context);
+typedef void (*kyt_success_callback)(int success, const char* error, void* context);
 typedef void (*kyt_text_callback)(const char* text, const char* error, void* context);
 /* The last message of an aggregation has no session information, no payload, and zeros. */
 typedef void (*kyt_aggregation_callback)(const kyt_dictionary* session_info, double timestamp,
@@ -86,6 +99,11 @@ KYT_API void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary
  * 3 both. */
 KYT_API int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type,
                              const kyt_dictionary* payload, uint32_t flag);
+/* The same with the daemon's answer: the text of what was posted, or null. */
+KYT_API void kyt_session_send_with_reply(kyt_session* session, uint16_t category, uint16_t type,
+                                         const kyt_dictionary* payload, uint32_t flag,
+                                         kyt_text_callback callback, void* context);
+KYT_API void kyt_session_fetch_display_url(kyt_session* session, kyt_text_callback callback, void* context);
 /* The callback gets the text of what was posted (or null), or the first error. */
 KYT_API void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* context);
 KYT_API void kyt_session_update_shared_data(kyt_session* session, const kyt_dictionary* entries);
@@ -93,6 +111,13 @@ KYT_API void kyt_session_remove_shared_data(kyt_session* session, const char* ke
 /* Algorithm 0 is HMAC-SHA1. */
 KYT_API void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t length,
                                         int32_t algorithm);
+
+/* Whether a back end took it. The file is opened at once, with the caller's rights; a file that cannot be opened is
+ * answered before the call returns. The array stays the caller's. */
+KYT_API void kyt_session_upload_file(kyt_session* session, const char* path, kyt_success_callback callback,
+                                     void* context);
+KYT_API void kyt_session_upload_log_data(kyt_session* session, const kyt_array* log_data,
+                                         kyt_success_callback callback, void* context);
 
 typedef struct kyt_statistics {
   uint64_t sent, dropped_queue_full, lost_on_connection_end, dropped_closed, dropped_invalid, connections,
