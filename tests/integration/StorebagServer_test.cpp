@@ -98,7 +98,7 @@ TEST_F(StorebagServer, IsAskedAgainWhenTheLifetimeIsOver) {
     last = configured(kEmrit);
     return last != "live: httppost" || nginx_->accesses().size() >= 2;
   }));
-  EXPECT_EQ(last, "live: httppost") << context();
+  ASSERT_EQ(last, "live: httppost") << context();
   EXPECT_GE(std::chrono::system_clock::now() - begin, std::chrono::seconds(1));
   EXPECT_EQ(nginx_->accesses()[1].find("GET /storebags/tolvar/emrit 304 "), 0U) << nginx_->accesses()[1];
 }
