@@ -29,10 +29,14 @@ TEST_F(HierarchyExample, DoesWhatTheGuideSays) {
   const Process call = process(), stream = process();
   ASSERT_EQ(example("call").size(), 6U);
   ASSERT_EQ(example("stream").size(), 4U);
-  for (const std::string& line : example("call")) call->step(line);
+  const std::vector<std::string> steps = example("call");
+  for (size_t i = 0; i < 3; ++i) call->step(steps[i]);
   const std::string own = call->line();
   EXPECT_NE(own.find("\"category\":0,\"type\":0"), std::string::npos) << own;
   EXPECT_EQ(call->line(), "live: httppost");
+  // Answered after what the call shares was taken; then the other process may begin.
+  EXPECT_EQ(call->ask(R"({"do":"displayURL"})"), "https://display.example.org/");
+  for (size_t i = 3; i < steps.size(); ++i) call->step(steps[i]);
 
   for (const std::string& line : example("stream")) stream->step(line);
   EXPECT_EQ(stream->line(), "live: httppost");
