@@ -166,6 +166,31 @@ TEST_F(AgentHierarchy, AnUpdateBeneathAnAggregatorShutsDownTheSessionsOwnAggrega
   EXPECT_FALSE(c.session->hasAggregator()) << "b no longer aggregates, but a does";
 }
 
+TEST_F(AgentHierarchy, AnUpdateLeavesOthersOfTheSameLevelAlone) {
+  const Client a = clientWith(sessionInfoAt(1, "T", 5), true),
+               sibling = clientWith(sessionInfoAt(1, "T", 6), true);
+  agent_.updateDownstreamSessions(*a.session);
+  EXPECT_TRUE(sibling.session->hasAggregator());
+  EXPECT_FALSE(logged(
+      LogLevel::debug,
+      "updateDownstreamSessions: Updating combined session ID and syncing reporting states for session 6"));
+}
+
+TEST_F(AgentHierarchy, AnUpdateReachesTheHighestLevelWhichIsNoNegativeNumber) {
+  const Client a = clientWith(sessionInfoAt(0), true), deep = clientWith(sessionInfoAt(-1, "T", 6), true);
+  agent_.updateDownstreamSessions(*a.session);
+  EXPECT_FALSE(deep.session->hasAggregator());
+}
+
+TEST_F(AgentHierarchy, AnUpdateOfAStandaloneSessionTouchesNobody) {
+  const Client alone = clientWith(sessionInfo(7, 5), true), other = clientWith(sessionInfoAt(1), true);
+  test_.sink.clear();
+  agent_.updateDownstreamSessions(*alone.session);
+  EXPECT_TRUE(other.session->hasAggregator());
+  EXPECT_TRUE(alone.session->hasAggregator());
+  EXPECT_TRUE(test_.sink.lines().empty());
+}
+
 TEST_F(AgentHierarchy, AnUpdateWithoutAnyAggregatorLeavesDeeperOnesAlone) {
   const Client a = clientWith(sessionInfoAt(0)), b = clientWith(sessionInfoAt(1), true);
   agent_.updateDownstreamSessions(*a.session);

@@ -49,6 +49,22 @@ TEST_F(ReportingdSessionLife, TakesAHierarchyTokenThatIsNoDictionaryForNone) {
   EXPECT_FALSE(client_.session->hierarchyToken());
 }
 
+TEST_F(ReportingdSessionLife, KnowsATokenThatIsNoTextByItsDescription) {
+  Dictionary info = sessionInfo();
+  info.set(kKYTReportingSessionInfoHierarchyToken, Dictionary{{kKYTReportingHierarchyTokenTokenID, 5}});
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_EQ(client_.session->hierarchyToken(), String("5"));
+  EXPECT_EQ(client_.session->hierarchyLevel(), 0U) << "no level is the top";
+}
+
+TEST_F(ReportingdSessionLife, HasALevelButNoTokenWithoutATokenID) {
+  Dictionary info = sessionInfo();
+  info.set(kKYTReportingSessionInfoHierarchyToken, Dictionary{{kKYTReportingHierarchyTokenLevel, 2}});
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_FALSE(client_.session->hierarchyToken());
+  EXPECT_EQ(client_.session->hierarchyLevel(), 2U);
+}
+
 TEST_F(ReportingdSessionLife, ReadsANegativeLevelAsAnUnsignedNumber) {
   client_.session->setSessionInfo(sessionInfoAtLevel(-1), std::nullopt, nullptr, false);
   EXPECT_EQ(client_.session->hierarchyLevel(), 4294967295U);
