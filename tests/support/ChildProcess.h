@@ -2,6 +2,8 @@
 #pragma once
 
 #include <fcntl.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -39,6 +41,16 @@ inline std::string inChildProcess(const std::function<std::string()>& work) {
   if (!WIFEXITED(status) || WEXITSTATUS(status) != 0)
     text += " [the process ended with " + std::to_string(status) + "]";
   return text;
+}
+
+// Whether a child may make mounts of its own: for root, unless this runs in a folder that is no mount (a plain chroot).
+inline bool mayMountOfItsOwn() {
+  return inChildProcess([]() -> std::string {
+           const bool own = ::unshare(CLONE_NEWNS) == 0 &&
+                            ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+           return own ? "" : "no";
+         })
+      .empty();
 }
 
 }  // namespace kyt
