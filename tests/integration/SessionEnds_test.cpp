@@ -176,13 +176,19 @@ TEST_F(SessionEnds, NothingOfHundredsOfKilledClientsStays) {
   int next = 1;
   for (int i = 0; i < (kSanitized ? 3 : 15); ++i) round(30, 100 * next++);
   const size_t before = descriptors();
-  const long threads = statusNumber("Threads"), memory = statusNumber("RssAnon");
-  for (int i = 0; i < (kSanitized ? 3 : 10); ++i) round(30, 100 * next++);
+  const long threads = statusNumber("Threads");
+  // Threads that a crowded machine adds bring heaps along, once; what a session leaves comes with every one.
+  long growth = 0;
+  for (int attempt = 0; attempt == 0 || (attempt < 5 && !kSanitized && growth >= 600); ++attempt) {
+    const long memory = statusNumber("RssAnon");
+    for (int i = 0; i < (kSanitized ? 3 : 10); ++i) round(30, 100 * next++);
+    growth = statusNumber("RssAnon") - memory;
+  }
   EXPECT_TRUE(comesBackTo(before)) << descriptors() << " after " << before;
   EXPECT_TRUE(eventually([&] { return statusNumber("Threads") <= threads + 8; }))
       << statusNumber("Threads") << " after " << threads;
   if (!kSanitized) {
-    EXPECT_LT(statusNumber("RssAnon"), memory + 600) << "KiB, after " << memory << ": 2 KiB for each session";
+    EXPECT_LT(growth, 600) << "KiB: 2 KiB for each session";
   }
 }
 
