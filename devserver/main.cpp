@@ -7,7 +7,6 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -21,6 +20,7 @@
 #include "devserver/Options.h"
 #include "devserver/Router.h"
 #include "devserver/Rows.h"
+#include "platform/linux/cli/CommandLine.h"
 
 namespace kyt::devserver {
 namespace {
@@ -28,6 +28,11 @@ namespace {
 int fail(const std::string& what) {
   std::fprintf(stderr, "kytdevserver: %s\n", what.c_str());
   return 1;
+}
+
+int failUsage(const std::string& what) {
+  fail(what);
+  return kWrongUsage;
 }
 
 // "[CLIENT=]HEX"
@@ -56,11 +61,13 @@ void describe(CLI::App& app, Options& options, std::vector<std::string>& digestK
       ->capture_default_str();
   app.add_option("--udp-port", options.udpPort, "Port of the dashboard feed (UDP); 0: any free one");
   app.add_option("--listen", options.listen, "Address to listen on")->capture_default_str();
-  app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)");
+  app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)")
+      ->allow_extra_args(false);
   app.add_option("--ready-file", options.readyFile, "Written when the ports are open: their numbers as JSON");
   app.add_flag("--http-events", options.httpEvents, "Take event posts and log data on the plain port too");
   app.add_option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control")->capture_default_str();
-  app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)");
+  app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)")
+      ->allow_extra_args(false);
   app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post as sent")->capture_default_str();
   app.add_option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON")->capture_default_str();
   app.add_option("--request-timeout", options.requestTimeout, "Seconds for a request to be whole")
@@ -169,16 +176,18 @@ int main(int argc, char** argv) {
   using namespace kyt::devserver;
   Options options;
   std::vector<std::string> digestKeys;
-  CLI::App app("A back end for development and tests: storebags, event posts, and a page that shows them");
+  CLI::App app("A back end for development and tests: storebags, event posts, and a page that shows them",
+               "kytdevserver");
+  kyt::addCommonOptions(app);
   describe(app, options, digestKeys);
-  CLI11_PARSE(app, argc, argv);
+  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
   for (const std::string& text : digestKeys) {
     const auto key = digestKeyFrom(text);
-    if (!key) return fail("--digest-key takes [CLIENT=]HEX");
+    if (!key) return failUsage("--digest-key takes [CLIENT=]HEX");
     options.digestKeys.push_back(*key);
   }
   if (!std::all_of(options.hosts.begin(), options.hosts.end(), isHost)) {
-    return fail("--host takes a name or an address");
+    return failUsage("--host takes a name or an address");
   }
   sigset_t signals;
   sigemptyset(&signals);

@@ -3,10 +3,11 @@
 // server, prints what arrived where, and stays up with the page open until Ctrl-C (or ends: --once).
 #include <signal.h>
 
-#include <CLI/CLI.hpp>
 #include <cstdio>
 
 #include "platform/TextEscape.h"
+#include "platform/linux/cli/CommandLine.h"
+#include "platform/linux/system/Process.h"
 #include "tools/StorebagFile.h"
 #include "tools/demo/Checks.h"
 #include "tools/demo/DemoBag.h"
@@ -80,15 +81,19 @@ int demonstrate(Stage& stage, bool once) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app("The daemon, the development server and real clients on this machine.", "kytdemo");
+  CLI::App app("The daemon, the development server and real clients on this machine", "kytdemo");
+  addCommonOptions(app);
   Stage::Options options;
+  options.programs = executableFolder();
+  options.share = options.programs + "/../share";
   bool once = false;
-  app.add_option("--programs", options.programs, "folder of the programs")->required();
-  app.add_option("--share", options.share, "folder of kytreporting/ with the bundles and the profile")
-      ->required();
-  app.add_option("--folder", options.folder, "lay out here and keep it (default: a temporary folder)");
-  app.add_flag("--once", once, "end after the checks; status 0 only if every event arrived as it should");
-  CLI11_PARSE(app, argc, argv);
+  app.add_option("--programs", options.programs, "Folder of the programs, instead of this one's own");
+  app.add_option(
+      "--share", options.share,
+      "Folder of kytreporting/ with the bundles and the profile, instead of ../share seen from this program");
+  app.add_option("--folder", options.folder, "Lay out here and keep it, instead of in a temporary folder");
+  app.add_flag("--once", once, "End after the checks; status 0 only if every event arrived as it should");
+  if (const auto status = parseCommandLine(app, argc, argv)) return *status;
   options.keepFolder = !options.folder.empty();
   options.serverArguments = {"--digest-key", std::string("kytdemo=") + kDemoDigestKeyHex};
   // Children inherit a clean mask; this process takes the two signals when it waits for them.

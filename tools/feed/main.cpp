@@ -6,7 +6,6 @@
 // Only "method" and "respCode" are required; events are numbered from 1, and happen now. Exit status: 0 when
 // everything was handed over and the back end has ended, 1 for a line that is none, 2 when there is no back
 // end.
-#include <CLI/CLI.hpp>
 #include <cmath>
 #include <cstdio>
 #include <fstream>
@@ -29,6 +28,7 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/LinuxUDPSocket.h"
+#include "platform/linux/cli/CommandLine.h"
 #include "platform/linux/system/DlopenPluginBundles.h"
 #include "platform/linux/system/JournalPowerLog.h"
 #include "platform/linux/system/LinuxDeviceProperties.h"
@@ -182,19 +182,20 @@ int feed(const Options& options, std::istream& in) {
 
 int main(int argc, char** argv) {
   kyt::tools::Options options;
-  CLI::App app("Feeds events to a dashboard server and prints their local log lines");
-  app.add_option("--server", options.server, "the server's IPv4 address")->required();
-  app.add_option("--port", options.port, "its UDP port")->required();
-  app.add_option("--reliable", options.reliable, "milliseconds between the ticks of reliable delivery");
-  app.add_flag("--without-profile", options.withoutProfile, "as a back end without one: reliable, 500 ms");
-  app.add_option("--session", options.session, "32 bits");
-  app.add_option("--client-type", options.clientType, "0 to 23");
-  app.add_option("--client-version", options.clientVersion, "16 bits");
-  app.add_option("--self-version", options.selfVersion, "the reporting side's version");
-  app.add_option("--device", options.device, "the device identifier; 40 characters are sent");
-  app.add_option("--interval", options.intervalMilliseconds, "milliseconds between events");
-  app.add_option("events", options.file, "a file with one JSON object a line, or - for standard input");
-  CLI11_PARSE(app, argc, argv);
+  CLI::App app("Feeds events to a dashboard server and prints their local log lines", "kytfeed");
+  kyt::addCommonOptions(app);
+  app.add_option("--server", options.server, "The server's IPv4 address")->required();
+  app.add_option("--port", options.port, "Its UDP port")->required();
+  app.add_option("--reliable", options.reliable, "Reliable delivery: milliseconds between its ticks");
+  app.add_flag("--without-profile", options.withoutProfile, "As a back end without one: reliable, 500 ms");
+  app.add_option("--session", options.session, "The session ID, 32 bits");
+  app.add_option("--client-type", options.clientType, "The client type, 0 to 23");
+  app.add_option("--client-version", options.clientVersion, "The client version, 16 bits");
+  app.add_option("--self-version", options.selfVersion, "The reporting side's version");
+  app.add_option("--device", options.device, "The device identifier; 40 characters are sent");
+  app.add_option("--interval", options.intervalMilliseconds, "Milliseconds between events");
+  app.add_option("events", options.file, "A file with one JSON object a line, or - for standard input");
+  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
   if (options.file == "-") return kyt::tools::feed(options, std::cin);
   std::ifstream file(options.file);
   if (!file) {

@@ -1,8 +1,6 @@
 // kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
 // consent, makes keys, signs and checks storebags.
-#include <CLI/CLI.hpp>
-#include <cstdio>
-
+#include "platform/linux/cli/CommandLine.h"
 #include "tools/kytctl/Commands.h"
 
 namespace {
@@ -20,29 +18,29 @@ struct Arguments {
 
 void addConnectionOptions(CLI::App& command, Arguments& arguments) {
   command.add_option("--socket", arguments.connection.socket,
-                     "the daemon's socket, instead of the fixed one");
-  command.add_option("--timeout", arguments.connection.timeoutSeconds, "seconds to wait for the daemon")
+                     "The daemon's socket, instead of the fixed one");
+  command.add_option("--timeout", arguments.connection.timeoutSeconds, "Seconds to wait for the daemon")
       ->check(CLI::Range(0.1, 3600.0));
 }
 
 void addSend(CLI::App& app, Arguments& a) {
-  CLI::App* send = app.add_subcommand("send", "send one event without a session of its own");
+  CLI::App* send = app.add_subcommand("send", "Send one event without a session of its own");
   addConnectionOptions(*send, a);
-  send->add_option("--client-type", a.send.clientType, "0 to 23")->required();
-  send->add_option("--session-id", a.send.sessionID, "32 bits");
-  send->add_option("--client-version", a.send.clientVersion, "16 bits");
-  send->add_option("--category", a.send.category, "the event's category (method)")->required();
-  send->add_option("--type", a.send.type, "the event's type (response code)")->required();
-  send->add_option("--payload", a.send.payloadJSON, "a JSON object");
+  send->add_option("--client-type", a.send.clientType, "The client type, 0 to 23")->required();
+  send->add_option("--session-id", a.send.sessionID, "The session ID, 32 bits");
+  send->add_option("--client-version", a.send.clientVersion, "The client version, 16 bits");
+  send->add_option("--category", a.send.category, "The event's category (method)")->required();
+  send->add_option("--type", a.send.type, "The event's type (response code)")->required();
+  send->add_option("--payload", a.send.payloadJSON, "A JSON object");
   send->add_option("--user-info", a.send.userInfoJSON,
-                   "a JSON object; ClientName and ServiceName choose the client entry");
-  send->add_flag("--require-user-info", a.send.requireUserInfo, "the session promises user information");
+                   "A JSON object; ClientName and ServiceName choose the client entry");
+  send->add_flag("--require-user-info", a.send.requireUserInfo, "The session promises user information");
   send->callback([&a] { a.status = sendCommand(a.connection, a.send); });
 
   CLI::App* session =
-      app.add_subcommand("session", "run a scripted session: one JSON object a line (kytctl session --help)");
+      app.add_subcommand("session", "Run a scripted session: one JSON object a line (kytctl session --help)");
   addConnectionOptions(*session, a);
-  session->add_option("script", a.script, "a file, or - for standard input")->required();
+  session->add_option("script", a.script, "A file, or - for standard input")->required();
   session->footer(
       "Steps, by \"do\"; from standard input each runs as soon as its line is there:\n"
       "  {\"do\":\"open\",\"sessionInfo\":{…},\"userInfo\":{…}}      first; the keys are SessionID, "
@@ -63,77 +61,77 @@ void addSend(CLI::App& app, Arguments& a) {
 }
 
 void addDefaults(CLI::App& app, Arguments& a) {
-  CLI::App* defaults = app.add_subcommand("defaults", "user defaults by domain and key");
+  CLI::App* defaults = app.add_subcommand("defaults", "User defaults by domain and key");
   defaults->require_subcommand(1);
-  CLI::App* read = defaults->add_subcommand("read", "print a value, or all of a domain");
-  read->add_option("domain", a.domain)->required();
-  read->add_option("key", a.key);
+  CLI::App* read = defaults->add_subcommand("read", "Print a value, or all of a domain");
+  read->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
+  read->add_option("key", a.key, "The key; without one all are printed");
   read->callback([&a] { a.status = defaultsReadCommand(a.connection.root, a.domain, a.key); });
-  CLI::App* write = defaults->add_subcommand("write", "store a value");
-  write->add_option("domain", a.domain)->required();
-  write->add_option("key", a.key)->required();
-  write->add_option("value", a.value)->required();
-  write->add_option("--type", a.type)->check(CLI::IsMember({"string", "integer", "real", "boolean"}));
+  CLI::App* write = defaults->add_subcommand("write", "Store a value");
+  write->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
+  write->add_option("key", a.key, "The key")->required();
+  write->add_option("value", a.value, "The value; put -- before one that begins with a minus sign")
+      ->required();
+  write->add_option("--type", a.type, "What the value is")
+      ->check(CLI::IsMember({"string", "integer", "real", "boolean"}))
+      ->capture_default_str();
   write->callback(
       [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, a.value); });
-  CLI::App* erase = defaults->add_subcommand("delete", "remove a value");
-  erase->add_option("domain", a.domain)->required();
-  erase->add_option("key", a.key)->required();
+  CLI::App* erase = defaults->add_subcommand("delete", "Remove a value");
+  erase->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
+  erase->add_option("key", a.key, "The key")->required();
   erase->callback(
       [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, std::nullopt); });
 
-  CLI::App* consent = app.add_subcommand("consent", "the owner's consent to diagnostics-and-usage upload");
+  CLI::App* consent = app.add_subcommand("consent", "The owner's consent to diagnostics-and-usage upload");
   consent->require_subcommand(1);
-  for (const char* change : {"show", "grant", "withdraw"})
-    consent->add_subcommand(change)->callback(
-        [&a, change] { a.status = consentCommand(a.connection.root, change); });
+  const std::pair<const char*, const char*> changes[] = {
+      {"show", "Print whether it is given"}, {"grant", "Give it"}, {"withdraw", "Take it back"}};
+  for (const auto& [change, what] : changes)
+    consent->add_subcommand(change, what)->callback([&a, change = change] {
+      a.status = consentCommand(a.connection.root, change);
+    });
 }
 
 void addStorebag(CLI::App& app, Arguments& a) {
-  CLI::App* keys = app.add_subcommand("keys", "keys for signing storebags");
+  CLI::App* keys = app.add_subcommand("keys", "Keys for signing storebags");
   keys->require_subcommand(1);
-  CLI::App* make = keys->add_subcommand("make", "write private.pem and publicKey.der into a folder");
-  make->add_option("folder", a.folder)->required();
-  make->add_option("--bits", a.bits, "2048 to 16384");
+  CLI::App* make = keys->add_subcommand("make", "Write private.pem and publicKey.der into a folder");
+  make->add_option("folder", a.folder, "The folder; made when missing, its parent must exist")->required();
+  make->add_option("--bits", a.bits, "Length of the key, 2048 to 16384")->capture_default_str();
   make->callback([&a] { a.status = makeKeysCommand(a.folder, a.bits); });
 
-  CLI::App* bag = app.add_subcommand("storebag", "signed configurations");
+  CLI::App* bag = app.add_subcommand("storebag", "Signed configurations");
   bag->require_subcommand(1);
-  CLI::App* sign = bag->add_subcommand("sign", "sign a bag into the document that servers hand out");
+  CLI::App* sign = bag->add_subcommand("sign", "Sign a bag into the document that servers hand out");
   sign->add_option("bag", a.sign.bag, "FILE.json, FILE.toml or FILE.plist")->required();
-  sign->add_option("--key", a.sign.key, "the private key, PEM")->required();
-  sign->add_option("-o,--output", a.sign.output, "the document; - for standard output")->required();
+  sign->add_option("--key", a.sign.key, "The private key, PEM")->required();
+  sign->add_option("-o,--output", a.sign.output, "The document; - for standard output")->required();
   sign->callback([&a] { a.status = signCommand(a.sign); });
-  CLI::App* verify = bag->add_subcommand("verify", "check a document's signature");
-  verify->add_option("document", a.document)->required();
-  verify->add_option("--public-key", a.publicKey, "publicKey.der")->required();
+  CLI::App* verify = bag->add_subcommand("verify", "Check a document's signature");
+  verify->add_option("document", a.document, "The document; - for standard input")->required();
+  verify->add_option("--public-key", a.publicKey, "The public key, publicKey.der")->required();
   verify->callback([&a] { a.status = verifyCommand(a.document, a.publicKey); });
   CLI::App* show =
-      bag->add_subcommand("show", "print the bag of a document as JSON, and what in it may surprise");
-  show->add_option("document", a.document)->required();
-  show->add_option("--public-key", a.publicKey, "check the signature first");
+      bag->add_subcommand("show", "Print the bag of a document as JSON, and what in it may surprise");
+  show->add_option("document", a.document, "The document; - for standard input")->required();
+  show->add_option("--public-key", a.publicKey, "Check the signature with this public key first");
   show->callback([&a] { a.status = showCommand(a.document, a.publicKey); });
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app("The command for people around kytreportingd.", "kytctl");
+  CLI::App app("The command for people around kytreportingd", "kytctl");
+  kyt::addCommonOptions(app);
   Arguments arguments;
   app.add_option("--root", arguments.connection.root,
-                 "stands in front of every fixed path, as the daemon's --root");
+                 "A folder that stands in front of every fixed path, as the daemon's --root");
   app.require_subcommand(1);
   app.fallthrough();
   addSend(app, arguments);
   addDefaults(app, arguments);
   addStorebag(app, arguments);
-  try {
-    app.parse(argc, argv);
-  } catch (const CLI::ParseError& error) {
-    return app.exit(error) == 0 ? 0 : 2;
-  } catch (const std::exception& error) {
-    std::fprintf(stderr, "kytctl: %s\n", error.what());
-    return 1;
-  }
+  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
   return arguments.status;
 }
