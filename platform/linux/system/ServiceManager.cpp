@@ -72,7 +72,11 @@ bool enterUtilityServiceClass() {
   errno = 0;
   const int nice = ::getpriority(PRIO_PROCESS, 0);
   if (errno != 0 || (nice < kUtilityNice && ::setpriority(PRIO_PROCESS, 0, kUtilityNice) != 0)) all = false;
-  if (::syscall(SYS_ioprio_set, kOfThread, 0, kBestEffortClass << 13 | kUtilityPriority) != 0) all = false;
+  // A service manager may have seen to it, and then not allow the call.
+  constexpr long wanted = kBestEffortClass << 13 | kUtilityPriority;
+  if (::syscall(SYS_ioprio_get, kOfThread, 0) != wanted &&
+      ::syscall(SYS_ioprio_set, kOfThread, 0, wanted) != 0)
+    all = false;
   return all;
 }
 
