@@ -86,8 +86,11 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
   }
   auto backend = std::make_shared<Made>(platform, name, profile, productFamily,
                                         std::get<std::unique_ptr<UDPSocket>>(std::move(opened)));
+  // On the network queue: a datagram that comes from anywhere before all is in place waits there until it is.
+  const bool started =
+      backend->networkProcQueue_->sync([&] { return backend->start(profile, serverIP, serverPort); });
   // What was made so far ends with the object: the sources, the queue, the socket.
-  if (!backend->start(profile, serverIP, serverPort)) return nullptr;
+  if (!started) return nullptr;
   return backend;
 }
 
@@ -174,7 +177,7 @@ DashboardDatagram::Header DashboardBackend::headerFor(const TimeValue& timestamp
   header.eventID = static_cast<uint16_t>(eventID);
   header.flags = static_cast<uint16_t>((reliableUDP_ ? DashboardDatagram::kFlagReliable : 0) |
                                        (usingProfile_ ? 0 : DashboardDatagram::kFlagWithoutProfile));
-  header.udid = udid_;
+  header.udid = udid_ != nullptr ? udid_ : "";
   return header;
 }
 

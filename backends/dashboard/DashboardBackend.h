@@ -92,7 +92,7 @@ class DashboardBackend : public KYTReportingBackend {
   std::optional<String> postURL_;  // constant after the making
 
  private:
-  // The making after the socket is open; false after a failure, which is logged.
+  // The making after the socket is open, on the network queue; false after a failure, which is logged.
   [[nodiscard]] bool start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
                            uint16_t serverPort);
   void readProfile(const Dictionary& profile);

@@ -116,6 +116,7 @@ void DashboardBackend::scheduleLastResort() {
   cleanupState_ = kLastResortScheduled;
   platform_.log.normal("DashboardBackend(myPeriodicTask): scheduled last resort clean-up in %d ms.",
                        kLastResortMilliseconds);
+  if (lastResort_) return;  // a second clean-up does not put off the end that the first one set
   lastResort_ = platform_.timers.after(
       std::chrono::milliseconds(kLastResortMilliseconds), networkProcQueue_, [weak = weak_from_this()] {
         if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->cleanupSources();
@@ -129,7 +130,7 @@ void DashboardBackend::cleanup() {
       return;
     }
     self->cleanupState_ = kCleaningUp;
-    self->keptAlive_ = self;
+    if (self->timer_) self->keptAlive_ = self;  // without a timer nothing would ever let go
   });
 }
 

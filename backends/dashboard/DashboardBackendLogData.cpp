@@ -1,9 +1,11 @@
 // The upload of a client's log data: one HTTP request, whose answer says where it can be found.
 #include "backends/dashboard/DashboardBackend.h"
+#include "platform/Counters.h"
 #include "platform/KeyedArchive.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
 #include "platform/Semaphore.h"
+#include "platform/TextEscape.h"
 
 namespace kyt {
 
@@ -24,7 +26,10 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.body = std::move(*body);
   const auto poster = connectivityDelegate();
   // Deliberately a success: the session is ending, and its client is not told that something is wrong.
-  if (poster == nullptr) return true;
+  if (poster == nullptr) {
+    platform_.counters.add(Reason::postWithoutPoster);
+    return true;
+  }
 
   Semaphore answered;
   std::optional<Data> reply;
@@ -43,12 +48,15 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
 // The status is deliberately not looked at: any body is taken for the location.
 bool DashboardBackend::finishUpload(const std::optional<Data>& reply, const std::optional<Error>& error) {
   if (error || !reply) {
+    platform_.counters.add(Reason::postFailed);
     platform_.log.error("DashboardBackend(uploadLogData): Error uploading log data array (%s)",
                         error ? error->localizedDescription.c_str() : "(null)");
     return false;
   }
-  const String location(reply->view());
-  platform_.log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s", location.c_str());
+  // What is no text is no location, but taken all the same.
+  const Value location = isValidUTF8(reply->view()) ? Value(String(reply->view())) : Value();
+  platform_.log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s",
+                       description(location).c_str());
   // Numbered like every event, but not sent: it ends in the base's operation that does nothing.
   sendMessage({{"LogDataUploadLocation", location}}, platform_.clock.timeOfDay(), 0, 2, MessageFlag{0});
   return true;

@@ -64,7 +64,9 @@ TimerHandle ManualTimers::after(Duration delay, std::shared_ptr<SerialQueue> que
   return arm(std::max(delay, Duration::zero()), Duration::zero(), std::move(queue), std::move(work));
 }
 
-TimerHandle ManualTimers::every(Duration period, Duration, std::shared_ptr<SerialQueue> queue, Task work) {
+TimerHandle ManualTimers::every(Duration period, Duration mostLate, std::shared_ptr<SerialQueue> queue,
+                                Task work) {
+  leeway = mostLate;
   period = std::max<Duration>(period, std::chrono::milliseconds(1));
   return arm(period, period, std::move(queue), std::move(work));
 }

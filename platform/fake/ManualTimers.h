@@ -1,6 +1,6 @@
 // The timer service of tests: time passes only in advance(), which moves the manual clock from one due time
 // to the next and hands the due work to its queues in that order. Nothing runs here: the test drains the
-// queues' executor. Leeway is not used: periodic work is due on the dot. Schedule from any thread; advance
+// queues' executor. Leeway is noted and not used: periodic work is due on the dot. Schedule from any thread; advance
 // from one at a time.
 #pragma once
 
@@ -26,6 +26,7 @@ class ManualTimers final : public TimerService {
   // From now on handles are empty, and `queues` notes what was asked for.
   bool refuses = false;
   std::vector<std::weak_ptr<SerialQueue>> queues;
+  Duration leeway{};  // of the last periodic timer
 
  private:
   struct Shared;

@@ -67,6 +67,7 @@ Watch ManualReactor::watch(int descriptor, unsigned events, Handler handler) {
   if (refuses) return {};
   auto registration = std::make_shared<Registration>(events, std::move(handler));
   watches_[descriptor] = registration;
+  if (whenWatched) whenWatched(descriptor);
   return Watch(std::move(registration));
 }
 

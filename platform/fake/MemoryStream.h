@@ -60,7 +60,8 @@ class ManualReactor final : public Reactor {
   bool report(int descriptor, unsigned events);
   // What the watch of a descriptor waits for; 0: nothing, or nobody watches it.
   [[nodiscard]] unsigned waitsFor(int descriptor) const;
-  bool refuses = false;  // to watch anything, as a system without memory does
+  bool refuses = false;                             // to watch anything, as a system without memory does
+  std::function<void(int descriptor)> whenWatched;  // called before watch() returns
 
  private:
   class Registration;

@@ -80,6 +80,15 @@ TEST_F(DashboardDelivery, AnAcknowledgementEndsTheFirstOfItsNumberAlone) {
   EXPECT_EQ(queued(), (std::vector<uint16_t>{6, 8}));
 }
 
+TEST_F(DashboardDelivery, TheNumberAfter65535IsAcknowledgedAsZero) {
+  ASSERT_NE(make(reliable()), nullptr);
+  for (const uint16_t number : {65534, 65535, 0, 1}) send(number);
+  EXPECT_TRUE(acknowledge(0));
+  EXPECT_EQ(queued(), (std::vector<uint16_t>{65534, 65535, 1}));
+  EXPECT_TRUE(acknowledge(65535));
+  EXPECT_EQ(queued(), (std::vector<uint16_t>{65534, 1}));
+}
+
 TEST_F(DashboardDelivery, AShortOrWrongAcknowledgementChangesNothing) {
   ASSERT_NE(make(reliable()), nullptr);
   send(0);
@@ -302,6 +311,34 @@ TEST_F(DashboardDelivery, ASecondCleanUpChangesNothing) {
   send(1);  // is kept, and goes nowhere
   EXPECT_EQ(socket().attempts, 0u);
   EXPECT_EQ(queued(), (std::vector<uint16_t>{1}));
+}
+
+TEST_F(DashboardDelivery, ASecondCleanUpDoesNotPutOffTheLastResort) {
+  ASSERT_NE(make(profile()), nullptr);
+  platform_.udpSockets.faults.send = 105;
+  send(1);
+  backend_->cleanup();
+  tick();
+  tick(1, 5000ms);
+  backend_->cleanup();
+  tick(1, 4499ms);
+  EXPECT_TRUE(socket().open);
+  tick(1, 1ms);
+  EXPECT_FALSE(socket().open);
+  EXPECT_EQ(platform_.timers.pending(), 0u);
+}
+
+// Nothing would ever end it again: its timer is gone.
+TEST_F(DashboardDelivery, ACleanUpAfterTheEndKeepsNothingAlive) {
+  ASSERT_NE(make(reliable()), nullptr);
+  backend_->cleanup();
+  send(1);
+  backend_->cleanup();
+  platform_.executor.runAll();
+  EXPECT_EQ(queued(), (std::vector<uint16_t>{1}));
+  const std::weak_ptr<DashboardBackend> watched = backend_;
+  backend_.reset();
+  EXPECT_TRUE(watched.expired());
 }
 
 TEST_F(DashboardDelivery, WithoutACleanUpItEndsWithItsOwner) {

@@ -101,6 +101,7 @@ TEST_F(LogData, IsTakenForPostedWhenThePosterIsGone) {
   poster_.reset();
   EXPECT_TRUE(backend_->uploadLogData(entries_));
   EXPECT_TRUE(platform_.sink.lines().empty());
+  EXPECT_EQ(platform_.counters.value(Reason::postWithoutPoster), 1u);
 }
 
 TEST_F(LogData, FailsWithTheErrorOfTheRequest) {
@@ -110,6 +111,7 @@ TEST_F(LogData, FailsWithTheErrorOfTheRequest) {
       errors("DashboardBackend(uploadLogData): Error uploading log data array (Could not connect to server)"),
       1u);
   EXPECT_EQ(platform_.sink.lines().size(), 1u);
+  EXPECT_EQ(platform_.counters.value(Reason::postFailed), 1u);
 }
 
 TEST_F(LogData, FailsWithoutDataInTheReply) {
@@ -126,6 +128,17 @@ TEST_F(LogData, TakesAnyBodyForTheLocation) {
   EXPECT_TRUE(platform_.sink.contains("DashboardBackend(uploadLogData): Log data uploaded to broken"));
   poster_->data = Data();
   EXPECT_TRUE(backend_->uploadLogData(entries_));
+}
+
+TEST_F(LogData, TakesABodyThatIsNoTextForNoLocation) {
+  const auto recording = RecordingDashboard::make(platform_, profile());
+  recording->setReportingSessionConnectivityDelegate(poster_);
+  poster_->data = Data(std::string_view("https://logs\xff"));
+  EXPECT_TRUE(recording->uploadLogData(entries_));
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::normal,
+                                      "DashboardBackend(uploadLogData): Log data uploaded to (null)"));
+  ASSERT_EQ(recording->messages.size(), 1u);
+  EXPECT_EQ(recording->messages[0], (Dictionary{{"LogDataUploadLocation", nullptr}}));
 }
 
 class WaitingPoster final : public ReportingSessionConnectivityInterface {

@@ -1,8 +1,10 @@
 // The making of the dashboard back end, the datagram byte for byte, and the local log line.
 #include "backends/dashboard/DashboardBackend.h"
 
+#include <chrono>
 #include <cstdlib>
 #include <new>
+#include <thread>
 
 #include "tests/backends/dashboard/DashboardFixture.h"
 
@@ -66,6 +68,30 @@ TEST_F(Dashboard, WithReliableInItsProfileBindsAndListens) {
   EXPECT_TRUE(backend_->reliableUDP());
   EXPECT_TRUE(socket().bound);
   EXPECT_EQ(platform_.reactor.waitsFor(socket().descriptor), ready::readable);
+}
+
+TEST_F(Dashboard, ItsTimerMayBe100MillisecondsLate) {
+  ASSERT_NE(make(profile()), nullptr);
+  EXPECT_EQ(platform_.timers.leeway, std::chrono::milliseconds(100));
+  // A short period has less, or ticks would be lost.
+  ASSERT_NE(make(profile({{"reliable", 50}})), nullptr);
+  EXPECT_EQ(platform_.timers.leeway, std::chrono::milliseconds(25));
+}
+
+// One that a stranger sends before the socket is connected is read when everything is in place, and the next
+// ones after it.
+TEST_F(Dashboard, ListensOnAfterADatagramThatCameWhileItWasMade) {
+  platform_.reactor.whenWatched = [this](int descriptor) {
+    std::thread([this, descriptor] {
+      EXPECT_TRUE(platform_.reactor.report(descriptor, ready::readable));
+      platform_.executor.runAll();
+    }).join();
+  };
+  ASSERT_NE(make(reliable()), nullptr);
+  platform_.executor.runAll();
+  send(7);
+  EXPECT_TRUE(acknowledge(7));
+  EXPECT_TRUE(queued().empty());
 }
 
 TEST_F(Dashboard, TakesThePortFromTextAndKeepsItsLow16Bits) {
@@ -216,6 +242,8 @@ TEST_F(Dashboard, ADeviceIdentifierIsCutAt40AndFilledUpWithZeros) {
   EXPECT_NE(send(1).find(" short 127.0.0.1 "), std::string::npos);
   EXPECT_EQ(socket().sent.back().substr(20, 40), "short" + std::string(35, '\0'));
   backend_->setUdid("");
+  EXPECT_NE(send(1).find("5.120  127.0.0.1 "), std::string::npos);
+  backend_->setUdid(nullptr);
   EXPECT_NE(send(1).find("5.120  127.0.0.1 "), std::string::npos);
 }
 

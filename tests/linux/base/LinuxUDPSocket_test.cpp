@@ -1,12 +1,8 @@
 // The system's datagram sockets on loopback.
 #include "platform/linux/base/LinuxUDPSocket.h"
 
-#include <arpa/inet.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include <array>
 #include <cerrno>
@@ -16,6 +12,7 @@
 #include "platform/Semaphore.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/UDPPeer.h"
 
 namespace kyt {
 namespace {
@@ -23,46 +20,6 @@ namespace {
 std::span<const std::byte> bytesOf(std::string_view text) {
   return std::as_bytes(std::span(text));
 }
-
-// A bare socket on a free port.
-class Peer {
- public:
-  Peer() : descriptor_(::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof address;
-    EXPECT_EQ(::bind(descriptor_, reinterpret_cast<sockaddr*>(&address), size), 0);
-    ::getsockname(descriptor_, reinterpret_cast<sockaddr*>(&address), &size);
-    port_ = ntohs(address.sin_port);
-    const timeval patience{30, 0};
-    ::setsockopt(descriptor_, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
-  }
-  ~Peer() { ::close(descriptor_); }
-  [[nodiscard]] uint16_t port() const { return port_; }
-  std::string receive(uint16_t* from = nullptr) const {
-    char buffer[2048];
-    sockaddr_in sender{};
-    socklen_t size = sizeof sender;
-    const ssize_t got =
-        ::recvfrom(descriptor_, buffer, sizeof buffer, 0, reinterpret_cast<sockaddr*>(&sender), &size);
-    if (from != nullptr) *from = ntohs(sender.sin_port);
-    return got < 0 ? "nothing" : std::string(buffer, static_cast<size_t>(got));
-  }
-  void sendTo(uint16_t port, std::string_view text) const {
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    address.sin_port = htons(port);
-    EXPECT_EQ(::sendto(descriptor_, text.data(), text.size(), 0, reinterpret_cast<sockaddr*>(&address),
-                       sizeof address),
-              static_cast<ssize_t>(text.size()));
-  }
-
- private:
-  int descriptor_;
-  uint16_t port_ = 0;
-};
 
 class LinuxUDPSocketTest : public ::testing::Test {
  protected:
@@ -73,7 +30,7 @@ class LinuxUDPSocketTest : public ::testing::Test {
   }
   static constexpr uint32_t kLoopback = 0x7F000001;
   LinuxUDPSocketFactory factory_;
-  Peer server_;
+  UDPPeer server_;
 };
 
 TEST_F(LinuxUDPSocketTest, SendsToItsPeerAndHearsItsAnswers) {
@@ -102,7 +59,7 @@ TEST_F(LinuxUDPSocketTest, HearsNoStranger) {
   ASSERT_EQ(socket->send(bytesOf("hello")), 5);
   uint16_t port = 0;
   ASSERT_EQ(server_.receive(&port), "hello");
-  const Peer stranger;
+  const UDPPeer stranger;
   stranger.sendTo(port, "from a stranger");
   server_.sendTo(port, "from the server");
   std::array<std::byte, 100> buffer{};
@@ -121,7 +78,7 @@ TEST_F(LinuxUDPSocketTest, AServerThatIsGoneIsAnErrorOfASend) {
   socket->suppressBrokenPipeSignal();
   uint16_t port = 0;
   {
-    const Peer gone;
+    const UDPPeer gone;
     port = gone.port();
   }
   ASSERT_EQ(socket->connect(kLoopback, port), 0);
