@@ -24,13 +24,12 @@ constexpr char kDescription[] = "Vidcall AFRC log";
 
 // A scheme, a host and nothing that cannot stand in an address.
 bool isAddress(std::string_view url) {
-  std::string_view rest = url;
-  if (rest.starts_with("https://"))
-    rest.remove_prefix(8);
-  else if (rest.starts_with("http://"))
-    rest.remove_prefix(7);
-  else
-    return false;
+  const size_t scheme = url.find("://");
+  if (scheme == url.npos) return false;
+  std::string name(url.substr(0, scheme));
+  for (char& c : name) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+  if (name != "https" && name != "http") return false;
+  const std::string_view rest = url.substr(scheme + 3);
   if (rest.empty() || rest.front() == '/' || rest.front() == '?') return false;
   for (const char c : url)
     if (static_cast<unsigned char>(c) <= ' ' || c == 0x7f) return false;

@@ -239,6 +239,13 @@ TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
   EXPECT_TRUE(poster_->requests.empty());
 }
 
+TEST_F(Upload, ASchemeMayBeInCapitals) {
+  profile_.set("post_url", "HTTPS://upload.example.org/in");
+  EXPECT_TRUE(upload());
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_TRUE(poster_->requests[0].url.starts_with("HTTPS://upload.example.org/in?uuid="));
+}
+
 // The server does not answer: the thread waits, and says so to the pool that it belongs to.
 TEST_F(Upload, BlocksItsWorkerUntilTheReplyAndLetsOthersRun) {
   std::atomic<bool> released{false};
