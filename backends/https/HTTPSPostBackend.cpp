@@ -92,8 +92,7 @@ Dictionary HTTPSPostBackend::mutablePayload(const Dictionary& message) const {
 
 void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
   platform_.log.debug(
-      "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message "
-      "dictionary");
+      "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
   payload.set("Opt", dnuType_);
   payload.set("SamplingThreshold", numberOrMinusOne(samplingThreshold()));
   payload.set("OverrideSampling", numberOrMinusOne(overrideSampling_));
@@ -132,8 +131,7 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
   if (state == kBackendStateEnabled && isRealtime(flag) &&
       stateQueue().sync([this] { return batchedEvents_.has_value(); })) {
     platform_.log.debug(
-        "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. "
-        "Forcing Flush here to keep events in order.");
+        "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here to keep events in order.");
     flushed = flushMessagesWithCompletion(nullptr);
   }
   platform_.log.debug("HTTPSPostBackend(sendMessage): Sending %d, %d, %d", state, batchEvents_,

@@ -175,8 +175,7 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
   const auto category = static_cast<uint16_t>(methodOf(record));
   if (!isWhitelistedEvent(category)) {
     platform_.log.debug(
-        "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend "
-        "%s",
+        "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend %s",
         category, name_.c_str());
     return false;
   }
