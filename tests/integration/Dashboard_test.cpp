@@ -53,6 +53,18 @@ TEST_F(DashboardFeedProgram, SendsEachEventOnceAndPrintsItsLine) {
   EXPECT_EQ(eventNumbers(), (std::vector<int>{1, 2, 3}));
 }
 
+// 5.004 is a little less as a binary number.
+TEST_F(DashboardFeedProgram, ATimeKeepsItsMilliseconds) {
+  std::string lines;
+  for (const char* time : {"5.004", "5.999999", "1769860800.252"})
+    lines += R"({"method":2,"respCode":3,"time":)" + std::string(time) + R"(,"message":{}})" + "\n";
+  const ProgramRun run = feed({}, lines);
+  EXPECT_EQ(run.status, 0) << run.text;
+  const std::string device = " " + std::string(40, '0') + " ";
+  for (const char* time : {"5.004", "5.996", "1769860800.252"})
+    EXPECT_NE(run.text.find(time + device), std::string::npos) << time << "\n" << run.text;
+}
+
 TEST_F(DashboardFeedProgram, SendsAgainWhatIsNotAcknowledged) {
   ASSERT_TRUE(stage_->control("/control/acknowledgements", R"({"action":"lose","times":1})"));
   ASSERT_TRUE(stage_->control("/control/acknowledgements", R"({"action":"corrupt","times":1})"));

@@ -6,6 +6,7 @@
 // Only "method" and "respCode" are required; events are numbered from 1, and happen now. Exit status: 0 when
 // everything was handed over and the back end has ended, 1 for a line that is none, 2 when there is no back
 // end.
+#include <algorithm>
 #include <cmath>
 #include <cstdio>
 #include <fstream>
@@ -121,8 +122,14 @@ std::shared_ptr<DashboardBackend> makeBackend(Machine& machine, const Options& o
 
 TimeValue timeFrom(const Value* time, const Clock& clock) {
   if (time == nullptr) return clock.timeOfDay();
-  const double seconds = std::floor(time->doubleValue());
-  return {static_cast<int64_t>(seconds), static_cast<int32_t>((time->doubleValue() - seconds) * 1000000)};
+  // Rounded: 5.004 is a little less than that as a binary number, and is meant as 5.004.
+  constexpr int64_t kMicrosecondsInSecond = 1000000;
+  constexpr double kMostSeconds = 1e12;
+  const int64_t microseconds = std::llround(std::clamp(time->doubleValue(), -kMostSeconds, kMostSeconds) *
+                                            static_cast<double>(kMicrosecondsInSecond));
+  int64_t seconds = microseconds / kMicrosecondsInSecond;
+  if (microseconds % kMicrosecondsInSecond < 0) --seconds;
+  return {seconds, static_cast<int32_t>(microseconds - seconds * kMicrosecondsInSecond)};
 }
 
 // Null when the line is no event.
