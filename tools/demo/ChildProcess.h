@@ -2,6 +2,8 @@
 // latest with this object, by its own process id, never by name.
 #pragma once
 
+#include <sys/types.h>
+
 #include <chrono>
 #include <optional>
 #include <string>
@@ -10,12 +12,24 @@
 
 namespace kyt::tools {
 
+// Whom a program runs as, without supplementary groups.
+struct User {
+  std::string name;
+  uid_t user = 0;
+  gid_t group = 0;
+  // By name, or by the digits of a number; none when the system knows nobody of that name.
+  [[nodiscard]] static std::optional<User> of(const std::string& name);
+};
+
 class ChildProcess {
  public:
   struct Options {
     std::vector<std::pair<std::string, std::string>> environment;  // besides this process's
     std::string outputFile;  // standard output and error go there (appended); empty: where this process's go
     std::string inputFile;   // empty: nothing
+    // None: as this process. Otherwise this process must be root's; `program` is a path then, and needs to be in reach of
+    // this process alone.
+    std::optional<User> user;
   };
   ChildProcess() = default;
   ChildProcess(ChildProcess&& other) noexcept;

@@ -1,8 +1,8 @@
 #include "tools/demo/Stage.h"
 
-#include <pwd.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -38,9 +38,8 @@ bool takesConnections(const std::string& path) {
   return taken;
 }
 
-std::string userName() {
-  const passwd* entry = getpwuid(geteuid());
-  return entry != nullptr ? entry->pw_name : "root";
+std::string grantedUser(const std::optional<User>& client) {
+  return std::to_string(client ? client->user : geteuid());
 }
 
 Value parsedJSON(const std::string& text) {
@@ -62,6 +61,7 @@ std::variant<std::unique_ptr<Stage>, Error> Stage::make(Options options) {
   if (auto error = stage->layOut()) return *error;
   if (auto error = stage->startServer()) return *error;
   if (auto error = stage->writeConfiguration()) return *error;
+  if (auto error = stage->handOverFolders()) return *error;
   return stage;
 }
 
@@ -122,8 +122,8 @@ std::optional<Error> Stage::writeConfiguration() {
                                httpsBase() + "\"\n[tls]\nca_file = \"" + options_.folder +
                                "/server/ca.pem\"\n" + "[log]\ntarget = \"stderr\"\n" + options_.extraSettings;
   if (auto error = writeFile(etc + "kytreportingd.toml", settings, 0644)) return error;
-  const std::string grant =
-      "[[grant]]\nuser = \"" + userName() + "\"\n\"com.vantu.private.kytreportingd\" = true\n";
+  const std::string grant = "[[grant]]\nuser = " + grantedUser(options_.clientUser) +
+                            "\n\"com.vantu.private.kytreportingd\" = true\n";
   if (auto error = writeFile(etc + "entitlements.d/stage.toml", grant, 0644)) return error;
   std::string device =
       "ProductVersion = \"12.1\"\nBuildVersion = \"12B7\"\nProductType = \"Board7,1\"\n"
@@ -133,6 +133,25 @@ std::optional<Error> Stage::writeConfiguration() {
   if (auto error = writeFile(etc + "device.toml", device, 0644)) return error;
   return writeFile(options_.folder + "/var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml",
                    std::string("consent = ") + (options_.consent ? "true" : "false") + "\n", 0644);
+}
+
+// What an installation gives the daemon's user: its state, its run folder and the message logs. Everybody may look in.
+std::optional<Error> Stage::handOverFolders() {
+  if (!options_.daemonUser && !options_.clientUser) return std::nullopt;
+  if (chmod(options_.folder.c_str(), 0755) != 0)
+    return failure(options_.folder + ": " + std::strerror(errno));
+  if (!options_.daemonUser) return std::nullopt;
+  const std::string logs = options_.folder + "/var/mobile/Library/Logs/Faultbin/Retired";
+  const std::string state = options_.folder + "/var/lib/kytreportingd/defaults";
+  std::error_code error;
+  fs::create_directories(logs, error);
+  if (error) return failure(logs + ": " + error.message());
+  for (const std::string& own :
+       {logs, state, state + "/com.vantu.diagnostics.toml", options_.folder + "/run/kytreportingd"}) {
+    if (chown(own.c_str(), options_.daemonUser->user, options_.daemonUser->group) != 0)
+      return failure(own + ": " + std::strerror(errno));
+  }
+  return std::nullopt;
 }
 
 std::optional<Error> Stage::putStorebag(const std::string& name, const Dictionary& bag) {
@@ -147,6 +166,7 @@ std::optional<Error> Stage::putStorebag(const std::string& name, const Dictionar
 std::optional<Error> Stage::startDaemon() {
   ChildProcess::Options how;
   how.outputFile = daemonLog();
+  how.user = options_.daemonUser;
   daemon_ = ChildProcess::start(program("kytreportingd"),
                                 {"--root", options_.folder, "--log-level", options_.logLevel}, how);
   if (!daemon_) return failure(program("kytreportingd") + ": " + std::strerror(errno));

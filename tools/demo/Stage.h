@@ -30,6 +30,9 @@ class Stage {
     std::string extraSettings;                 // appended to kytreportingd.toml
     std::vector<std::string> serverArguments;  // further ones for the development server
     bool keepFolder = false;
+    // As in an installation, where the daemon has a user of its own and its clients have theirs; both are this process's
+    // when none are given. Others need root.
+    std::optional<User> daemonUser, clientUser;
   };
   // The folder laid out, the development server running. The daemon is started by startDaemon().
   [[nodiscard]] static std::variant<std::unique_ptr<Stage>, Error> make(Options options);
@@ -52,6 +55,8 @@ class Stage {
   [[nodiscard]] bool waitForEvents(int64_t count, int seconds) const;
   [[nodiscard]] bool control(const std::string& path, const std::string& json) const;
 
+  [[nodiscard]] const std::optional<User>& daemonUser() const { return options_.daemonUser; }
+  [[nodiscard]] const std::optional<User>& clientUser() const { return options_.clientUser; }
   [[nodiscard]] const std::string& folder() const { return options_.folder; }
   [[nodiscard]] std::string program(const std::string& name) const { return options_.programs + "/" + name; }
   [[nodiscard]] std::string socketPath() const {
@@ -69,6 +74,7 @@ class Stage {
   [[nodiscard]] std::optional<Error> layOut();
   [[nodiscard]] std::optional<Error> startServer();
   [[nodiscard]] std::optional<Error> writeConfiguration();
+  [[nodiscard]] std::optional<Error> handOverFolders();
 
   Options options_;
   std::string privateKey_;

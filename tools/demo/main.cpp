@@ -2,8 +2,10 @@
 // the daemon under a private root, lets real client processes report real events, checks each of them at the
 // server, prints what arrived where, and stays up with the page open until Ctrl-C (or ends: --once).
 #include <signal.h>
+#include <unistd.h>
 
 #include <cstdio>
+#include <fstream>
 
 #include "platform/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
@@ -29,6 +31,7 @@ std::optional<std::string> runClient(Stage& stage, const std::string& name, cons
   if (auto error = writeFile(file, script, 0644)) return error->localizedDescription;
   ChildProcess::Options how;
   how.outputFile = stage.folder() + "/" + name + ".log";
+  how.user = stage.clientUser();
   auto client =
       ChildProcess::start(stage.program("kytctl"), {"session", "--socket", stage.socketPath(), file}, how);
   if (!client) return "kytctl cannot be started";
@@ -36,6 +39,27 @@ std::optional<std::string> runClient(Stage& stage, const std::string& name, cons
   if (status == 0) return std::nullopt;
   auto said = readFile(how.outputFile);
   return "the client process " + name + " failed: " + (said.index() == 0 ? std::get<std::string>(said) : "");
+}
+
+// Of the daemon's process, as the kernel has it.
+std::string processStatus(Stage& stage, const std::string& key) {
+  std::ifstream status("/proc/" + std::to_string(stage.daemon()->pid()) + "/status");
+  for (std::string line; std::getline(status, line);)
+    if (line.starts_with(key + ":\t")) return line.substr(key.size() + 2);
+  return {};
+}
+
+// Another user's daemon has that user's rights alone, and can gain none.
+Check checkUser(Stage& stage) {
+  const std::string id = std::to_string(stage.daemonUser()->user);
+  const std::string ids = processStatus(stage, "Uid"), groups = processStatus(stage, "Groups"),
+                    capabilities = processStatus(stage, "CapPrm"),
+                    closed = processStatus(stage, "NoNewPrivs");
+  return {"the daemon runs as its own user, without capabilities, and can gain none",
+          ids == id + "\t" + id + "\t" + id + "\t" + id &&
+              groups.find_first_of("0123456789") == std::string::npos &&
+              capabilities.find_first_not_of('0') == std::string::npos && closed == "1",
+          ids + "; groups " + groups + "; capabilities " + capabilities + "; NoNewPrivs " + closed};
 }
 
 void waitForInterrupt() {
@@ -53,6 +77,10 @@ int demonstrate(Stage& stage, bool once) {
   if (auto error = stage.putStorebag("dulvek", demoBag(stage.httpsBase(), "httppost", "kytdemo-plain")))
     return complain(error->localizedDescription);
   if (auto error = stage.startDaemon()) return complain(error->localizedDescription);
+  if (stage.daemonUser() && stage.clientUser())
+    std::printf("users     the daemon runs as %s (%u), its clients as %s (%u)\n",
+                stage.daemonUser()->name.c_str(), stage.daemonUser()->user, stage.clientUser()->name.c_str(),
+                stage.clientUser()->user);
   std::printf("daemon    socket %s, log %s\nserver    %s, page %s/\n", stage.socketPath().c_str(),
               stage.daemonLog().c_str(), stage.httpsBase().c_str(), stage.httpBase().c_str());
   if (auto problem = runClient(stage, "signed", signedClientScript())) return complain(*problem);
@@ -61,7 +89,9 @@ int demonstrate(Stage& stage, bool once) {
     std::printf("not all of %d events arrived within 30 s\n", kDemoEvents);
 
   int wrong = 0;
-  for (const Check& check : checkArrivals(stage)) {
+  std::vector<Check> checks = checkArrivals(stage);
+  if (stage.daemonUser()) checks.push_back(checkUser(stage));
+  for (const Check& check : checks) {
     std::printf("%s  %s%s%s\n", check.holds ? "ok   " : "WRONG", check.what.c_str(), check.holds ? "" : ": ",
                 check.holds ? "" : escapedText(check.found).c_str());
     if (!check.holds) ++wrong;
@@ -86,14 +116,25 @@ int main(int argc, char** argv) {
   Stage::Options options;
   options.programs = executableFolder();
   options.share = options.programs + "/../share";
+  std::string daemonUser = "daemon", clientUser = "nobody";
   bool once = false;
   app.add_option("--programs", options.programs, "Folder of the programs, instead of this one's own");
   app.add_option(
       "--share", options.share,
       "Folder of kytreporting/ with the bundles and the profile, instead of ../share seen from this program");
   app.add_option("--folder", options.folder, "Lay out here and keep it, instead of in a temporary folder");
+  app.add_option("--daemon-user", daemonUser, "Started by root: whom the daemon runs as")
+      ->capture_default_str();
+  app.add_option("--client-user", clientUser, "Started by root: whom its clients run as")
+      ->capture_default_str();
   app.add_flag("--once", once, "End after the checks; status 0 only if every event arrived as it should");
   if (const auto status = parseCommandLine(app, argc, argv)) return *status;
+  if (geteuid() == 0) {
+    options.daemonUser = User::of(daemonUser);
+    options.clientUser = User::of(clientUser);
+    if (!options.daemonUser) return complain("there is no user " + daemonUser);
+    if (!options.clientUser) return complain("there is no user " + clientUser);
+  }
   options.keepFolder = !options.folder.empty();
   options.serverArguments = {"--digest-key", std::string("kytdemo=") + kDemoDigestKeyHex};
   // Children inherit a clean mask; this process takes the two signals when it waits for them.
