@@ -81,6 +81,7 @@ std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::opti
                                                    name ? Value(*name) : Value(), version});
   request.timeout = kRequestTimeout;
   request.maxRedirects = kMaxRedirects;
+  request.isAwaited = true;
   const std::string address = request.url;
   log.debug("fetchStorebagWithName: Storebag Server URL: %s", address.c_str());
   const bool conditional = lastModified != nullptr && lastModified->has_value();
@@ -197,22 +198,12 @@ StorebagFetcher::Reply StorebagFetcher::sendSynchronousRequest(URLRequest reques
     Reply reply;
   };
   auto wait = std::make_shared<Wait>();
-  {
-    MutexLock lock(mutex_);
-    if (cancelled_) {
-      wait->reply.error = Error{kKYTURLErrorDomain, kURLErrorCancelled, "cancelled"};
-      return std::move(wait->reply);
-    }
-    task_ = urlSession().start(
-        std::move(request),
-        [wait](std::optional<Data> data, std::optional<URLResponse> response, std::optional<Error> error) {
-          wait->reply = Reply{std::move(data), std::move(response), std::move(error)};
-          wait->done.signal();
-        });
-  }
+  urlSession().start(std::move(request), [wait](std::optional<Data> data, std::optional<URLResponse> response,
+                                                std::optional<Error> error) {
+    wait->reply = Reply{std::move(data), std::move(response), std::move(error)};
+    wait->done.signal();
+  });
   wait->done.wait();
-  MutexLock lock(mutex_);
-  task_.reset();
   return std::move(wait->reply);
 }
 
@@ -224,16 +215,6 @@ URLSession& StorebagFetcher::urlSession() {
     urlSession_ = configuration_.platform.urlSessions.create(std::move(configuration));
   }
   return *urlSession_;
-}
-
-void StorebagFetcher::cancel() {
-  std::shared_ptr<URLTask> task;
-  {
-    MutexLock lock(mutex_);
-    cancelled_ = true;
-    task = task_;
-  }
-  if (task != nullptr) task->cancel();
 }
 
 }  // namespace kyt

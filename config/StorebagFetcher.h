@@ -3,7 +3,8 @@
 // (daemon/ReportingdAgent.h) and makes its calls under its monitor, so that several sessions that need the
 // same bag download it once.
 //
-// A fetch blocks its thread until the reply is there, at most 15 seconds. The requests of the whole process
+// A fetch blocks its thread until the reply is there, at most 15 seconds, or until the shut-down cancels what
+// threads wait for; then none can begin any more. The requests of the whole process
 // go through one URL session, made at first use while holding the lock of the class KYTReportingBackend,
 // which the composition root owns. Every failure is an absent result and one log line at most; nothing here
 // is fatal.
@@ -41,9 +42,6 @@ class StorebagFetcher {
       int32_t clientType, int32_t& maxAge, std::optional<String>& version, bool& notModified,
       std::optional<String>* lastModified);
 
-  // Shut-down: a download under way ends with an error, later ones do not start. Any thread, never blocks.
-  void cancel();
-
  private:
   struct Reply {
     std::optional<Data> data;
@@ -52,15 +50,12 @@ class StorebagFetcher {
   };
 
   Reply sendSynchronousRequest(URLRequest request);
-  URLSession& urlSession() REQUIRES(mutex_);
+  URLSession& urlSession();
   std::optional<Dictionary> verifiedBag(const Reply& reply);
 
   Configuration configuration_;
   Mutex& backendClassLock_;
-  Mutex mutex_;
-  std::unique_ptr<URLSession> urlSession_ GUARDED_BY(mutex_);
-  std::shared_ptr<URLTask> task_ GUARDED_BY(mutex_);
-  bool cancelled_ GUARDED_BY(mutex_) = false;
+  std::unique_ptr<URLSession> urlSession_ GUARDED_BY(backendClassLock_);
 };
 
 }  // namespace kyt

@@ -147,8 +147,9 @@ bool DaemonServices::isIdle() {
 void DaemonServices::shutDown() {
   const Deadline deadline(clock_, settings_.limits.shutdownGraceSeconds);
   listener_.stopAccepting();
-  // Before anything that needs the agent's monitor, which a download holds.
-  fetcher_.cancel();
+  // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
+  // monitor, which a download holds, and so that no session's end waits behind its own upload.
+  urlSessions_.cancelAwaited();
   endSessions(deadline);
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))

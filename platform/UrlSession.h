@@ -36,6 +36,8 @@ struct URLRequest {
   Data body;
   std::optional<Duration> timeout;  // from start to end, progress or not; none: only the no-progress time-out
   bool allowsCellularAccess = true;
+  bool isAwaited =
+      false;  // a thread does nothing else until it completes; see URLSessionFactory::cancelAwaited
   int maxRedirects = 0;  // followed only while they stay on https
 };
 
@@ -98,7 +100,10 @@ class URLSessionFactory {
  public:
   virtual ~URLSessionFactory() = default;
   [[nodiscard]] virtual std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) = 0;
-  // Shut-down: every request of every session ends with kURLErrorCancelled, and none can be started any more.
+  // Shut-down, its beginning: requests that threads wait for end with kURLErrorCancelled, wherever they are on
+  // their way, and no such request can be started any more. All others go on, and new ones can be started.
+  virtual void cancelAwaited() = 0;
+  // Shut-down, its end: every request of every session ends with kURLErrorCancelled, and none can be started any more.
   virtual void cancelAll() = 0;
   [[nodiscard]] virtual URLFigures figures() const = 0;
   // Requests not completed yet; the daemon's shut-down waits for zero.

@@ -143,6 +143,7 @@ std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, D
        String(percentEncodedForQuery(kDescription)), String(percentEncodedForQuery(compressedName))});
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
   request.body = std::move(body);
+  request.isAwaited = true;
   return request;
 }
 

@@ -42,7 +42,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     if (!refused && !tooMuch) entry.charge = charge;
     {
       std::lock_guard lock(mutex_);
-      refused = refused || cancelled_ || tooMuch;
+      refused = refused || cancelled_ || (awaitedCancelled_ && entry.request.isAwaited) || tooMuch;
       if (tooMuch) ++figures_.refused;
       index = entries_.size();
       if (!refused) responder = responder_;
@@ -100,6 +100,17 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     answer(index, std::move(reply));
   }
 
+  void cancelAwaited() {
+    std::vector<size_t> awaited;
+    {
+      std::lock_guard lock(mutex_);
+      awaitedCancelled_ = true;
+      for (size_t index = 0; index < entries_.size(); ++index)
+        if (entries_[index]->request.isAwaited) awaited.push_back(index);
+    }
+    for (const size_t index : awaited) cancel(index);
+  }
+
   void cancelAll() {
     size_t count = 0;
     {
@@ -131,7 +142,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
   Responder responder_;
   URLFigures figures_;
   size_t open_ = 0, sessions_ = 0, invalidated_ = 0;
-  bool cancelled_ = false;
+  bool cancelled_ = false, awaitedCancelled_ = false;
 };
 
 namespace {
@@ -191,6 +202,10 @@ FakeURLSessionFactory::~FakeURLSessionFactory() {
 
 std::unique_ptr<URLSession> FakeURLSessionFactory::create(URLSessionConfiguration configuration) {
   return std::make_unique<FakeURLSession>(state_, std::move(configuration));
+}
+
+void FakeURLSessionFactory::cancelAwaited() {
+  state_->cancelAwaited();
 }
 
 void FakeURLSessionFactory::cancelAll() {

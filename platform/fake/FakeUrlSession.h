@@ -37,6 +37,7 @@ class FakeURLSessionFactory final : public URLSessionFactory {
   ~FakeURLSessionFactory() override;
 
   [[nodiscard]] std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) override;
+  void cancelAwaited() override;
   void cancelAll() override;
   [[nodiscard]] URLFigures figures() const override;
   [[nodiscard]] size_t outstanding() const override;

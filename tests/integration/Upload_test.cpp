@@ -19,15 +19,15 @@ namespace {
 using Clock = std::chrono::steady_clock;
 using Milliseconds = std::chrono::duration<double, std::milli>;
 
-constexpr int kCadmor = 20, kDulvek = 8, kWithAdaptor = 7;
+constexpr int kTorvel = 5, kCadmor = 20, kDulvek = 8, kWithAdaptor = 7;
 
 class Uploads : public StageTest {
  protected:
   // One bag with an upload server for the name, one whose sessions only report events.
-  void prepare(const std::string& address = "/upload") {
-    lay();
+  void prepare(tools::Stage::Options options = {}) {
+    lay(std::move(options));
     Dictionary backends = section({entry("uploading")});
-    backends.set("uploadserver", Dictionary{{"post_url", stage_->httpsBase() + address}});
+    backends.set("uploadserver", Dictionary{{"post_url", stage_->httpsBase() + "/upload"}});
     const Dictionary bag{{"version", "1"}, {"release", backends}};
     const auto problem = stage_->putStorebag("cadmor", bag);
     ASSERT_FALSE(problem) << problem->localizedDescription;
@@ -109,6 +109,70 @@ TEST_F(Uploads, ASessionWithoutAnUploadServerTakesNoFile) {
   EXPECT_EQ(upload(client, file), "no");
   EXPECT_TRUE(std::filesystem::exists(file));
   EXPECT_TRUE(client.finish());
+}
+
+// Everything that a thread can wait for at once: a file upload, a log upload and a storebag, from servers that
+// never answer. The deadline is far away, so only their cancelling lets the daemon end now, and what the sessions
+// hold goes out all the same.
+TEST_F(Uploads, ThatNobodyAnswersEndWithTheDaemonAndLoseNoEvent) {
+  tools::Stage::Options options;
+  options.extraSettings = "[service]\nshutdown_grace_seconds = 30\n";
+  options.logLevel = "debug";
+  lay(std::move(options));
+  Dictionary files = section({entry("uploading"), entry("waiting")}), logs = section({entry("logging")});
+  files.set("uploadserver", Dictionary{{"post_url", stage_->httpsBase() + "/upload"}});
+  logs.set("dashboard",
+           Dictionary{{"ip", "127.0.0.1"}, {"port", 9}, {"post_url", stage_->httpsBase() + "/logdata"}});
+  ASSERT_FALSE(stage_->putStorebag("cadmor", Dictionary{{"version", "1"}, {"release", files}}));
+  ASSERT_FALSE(stage_->putStorebag("torvel", Dictionary{{"version", "1"}, {"release", logs}}));
+  startDaemon();
+  for (const char* path : {"/upload", "/logdata", "/bags/tolvar/dulvek"})
+    ASSERT_TRUE(
+        stage_->control("/control/reply", R"({"hang":true,"times":0,"path":")" + std::string(path) + "\"}"));
+
+  TestClient uploading(socket(), kCadmor, "uploading", 1), waiting(socket(), kCadmor, "waiting", 2);
+  TestClient logging(socket(), kTorvel, "logging", 3), fetching(socket(), kDulvek, "reporting", 4);
+  ASSERT_EQ(uploading.configure(), "live: httppost uploadserver") << daemonLog();
+  ASSERT_EQ(waiting.configure(), "live: httppost uploadserver") << daemonLog();
+  ASSERT_EQ(logging.configure(), "live: httppost dashboard") << daemonLog();
+  for (TestClient* client : {&uploading, &waiting, &logging})
+    EXPECT_TRUE(client->send(9, 200, Dictionary{{"k", "v"}}));
+  const std::string file = files_.write("report.log", "contents"), other = files_.write("other.log", "more");
+  const auto uploaded = startUpload(uploading, file), later = startUpload(uploading, other),
+             alsoUploaded = startUpload(waiting, other);
+  const auto logged = std::make_shared<std::promise<std::string>>();
+  logging->uploadLogData(Array{"entry"}, [logged](bool accepted, const std::optional<Error>& error) {
+    logged->set_value(error ? error->localizedDescription : accepted ? "accepted" : "refused");
+  });
+  ASSERT_TRUE(eventually([&] { return total("posts") == 2 && total("logs") == 1; })) << daemonLog();
+  const auto configured = std::make_shared<std::promise<std::string>>();
+  fetching->startConfiguration(
+      [configured](const std::optional<std::vector<std::string>>& states, const std::optional<Error>& error) {
+        configured->set_value(error ? error->localizedDescription : states ? "configured" : "none");
+      });
+  ASSERT_TRUE(eventually([&] { return Uploads::logged("Fetching storebag for client type 8"); }));
+
+  const auto begin = Clock::now();
+  EXPECT_EQ(stage_->stopDaemon(std::chrono::seconds(60)).value_or(-1), 0) << daemonLog();
+  EXPECT_LT(Clock::now() - begin, std::chrono::seconds(10)) << daemonLog();
+  // Deliberately yes: a request was sent, and that is all that this answer says. The log says how it ended.
+  EXPECT_EQ(TestClient::waitFor(uploaded), "yes");
+  EXPECT_EQ(TestClient::waitFor(alsoUploaded), "yes");
+  EXPECT_EQ(TestClient::waitFor(logged), "refused");
+  EXPECT_EQ(TestClient::waitFor(configured), "none");
+  // Behind the first in the same session: it is not begun, or refused at once.
+  EXPECT_NE(TestClient::waitFor(later), "no answer");
+  EXPECT_EQ(contents(file), "contents");
+  EXPECT_EQ(contents(other), "more");
+  EXPECT_TRUE(Uploads::logged("<3>UploadBackend(uploadFileAtPath): post The request was cancelled"));
+  EXPECT_TRUE(Uploads::logged(
+      "<3>DashboardBackend(uploadLogData): Error uploading log data array (The request was cancelled)"));
+  EXPECT_FALSE(Uploads::logged("shutDown: Sessions have not ended in time"));
+  for (const char* client : {"uploading", "waiting", "logging"}) {
+    EXPECT_TRUE(arrive("method=9&status=200&client=" + std::string(client), 1)) << client << daemonLog();
+    EXPECT_TRUE(arrive("method=0&status=1&client=" + std::string(client), 1)) << client << daemonLog();
+  }
+  EXPECT_EQ(total("posts"), 2 + 3) << "no upload was begun after the first two";
 }
 
 // Two hundred sessions wait in uploads on a server that does not answer. The bound asserted: the median of

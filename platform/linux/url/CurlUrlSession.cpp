@@ -46,6 +46,9 @@ std::unique_ptr<URLSession> CurlURLSessionFactory::create(URLSessionConfiguratio
       std::make_shared<URLSessionState>(network_, std::move(configuration)));
 }
 
+void CurlURLSessionFactory::cancelAwaited() {
+  network_->cancelAwaited();
+}
 void CurlURLSessionFactory::cancelAll() {
   network_->cancelAll();
 }

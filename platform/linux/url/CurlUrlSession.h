@@ -50,6 +50,7 @@ class CurlURLSessionFactory final : public URLSessionFactory {
   ~CurlURLSessionFactory() override;
 
   [[nodiscard]] std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) override;
+  void cancelAwaited() override;
   void cancelAll() override;
   [[nodiscard]] URLFigures figures() const override;
   [[nodiscard]] size_t outstanding() const override;

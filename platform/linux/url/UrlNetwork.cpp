@@ -72,8 +72,17 @@ void URLNetwork::invalidate(std::shared_ptr<URLSessionState> session) {
   submit({Kind::invalidate, nullptr, std::move(session)});
 }
 
+void URLNetwork::cancelAwaited() {
+  awaitedCancelled_ = true;
+  wakeUp();
+}
+
 void URLNetwork::cancelAll() {
   cancelled_ = true;
+  wakeUp();
+}
+
+void URLNetwork::wakeUp() {
   MutexLock lock(mutex_);
   if (running_) eventfd_write(wake_, 1);
 }
@@ -150,8 +159,8 @@ void URLNetwork::run() {
   for (;;) {
     takeCommands();
     deadlines_.fireUntil(now_);
+    cancelWhatIsUnwanted();
     if (cancelled_.load()) {
-      cancelEverything();
       MutexLock lock(mutex_);
       if (stopping_ && commands_.empty()) break;
     }
@@ -214,6 +223,8 @@ void URLNetwork::begin(std::shared_ptr<URLTransfer> transfer) {
   begun.started = now_;
   if (begun.refusal == URLTransfer::Refusal::invalidated || cancelled_.load()) {
     fail(begun, kURLErrorCancelled, "The URL session was invalidated");
+  } else if (begun.request.isAwaited && awaitedCancelled_.load()) {
+    fail(begun, kURLErrorCancelled, "The request was cancelled");
   } else if (begun.refusal == URLTransfer::Refusal::tooMuch) {
     refuse(begun);
   } else if (!namesItsScheme(begun.request.url)) {
@@ -335,15 +346,25 @@ void URLNetwork::finish(URLTransfer& transfer) {
   queue->async([delivered] { delivered->deliver(); });
 }
 
-void URLNetwork::cancelEverything() {
+void URLNetwork::cancelWhatIsUnwanted() {
+  if (cancelled_.load()) {
+    cancelRequests(Which::all);
+  } else if (awaitedCancelled_.load() && !std::exchange(awaitedGone_, true)) {
+    cancelRequests(Which::awaited);
+  }
+}
+
+void URLNetwork::cancelRequests(Which which) {
   for (URLSessionState* session = sessions_.first(); session != nullptr;) {
-    URLSessionState* next = session->links.next;
-    std::shared_ptr<URLSessionState> kept;  // while its last request goes
-    while (URLTransfer* transfer = session->transfers.first()) {
-      kept = transfer->session;
-      fail(*transfer, kURLErrorCancelled, "The request was cancelled");
+    URLSessionState* nextSession = session->links.next;
+    const std::shared_ptr<URLSessionState> kept = session->self;  // while its last request goes
+    for (URLTransfer* transfer = session->transfers.first(); transfer != nullptr;) {
+      URLTransfer* next = transfer->links.next;
+      if (which == Which::all || transfer->request.isAwaited)
+        fail(*transfer, kURLErrorCancelled, "The request was cancelled");
+      transfer = next;
     }
-    session = next;
+    session = nextSession;
   }
 }
 

@@ -64,6 +64,7 @@ class URLNetwork {
   void start(std::shared_ptr<URLTransfer> transfer);
   void cancel(std::shared_ptr<URLTransfer> transfer);
   void invalidate(std::shared_ptr<URLSessionState> session);
+  void cancelAwaited();
   void cancelAll();
   void stop();  // once, not from a thread of this network
   void completionHasRun();
@@ -92,7 +93,10 @@ class URLNetwork {
     std::shared_ptr<URLSessionState> session;
   };
 
+  enum class Which : uint8_t { all, awaited };
+
   void submit(Command command);
+  void wakeUp();
   [[nodiscard]] bool startThread() REQUIRES(mutex_);
   void run();
   void handleEvent(uint64_t which, uint32_t events);
@@ -106,7 +110,8 @@ class URLNetwork {
   void finish(URLTransfer& transfer);    // its result is set
   void fail(URLTransfer& transfer, int32_t code, std::string description);
   void unlistIfUnused(URLSessionState& session);
-  void cancelEverything();
+  void cancelWhatIsUnwanted();
+  void cancelRequests(Which which);
 
   // Waiting for connectivity (UrlNetworkWaiting.cpp).
   class Answers;
@@ -127,7 +132,7 @@ class URLNetwork {
 
   // Self-synchronised.
   std::atomic<size_t> outstanding_{0};
-  std::atomic<bool> cancelled_{false};
+  std::atomic<bool> cancelled_{false}, awaitedCancelled_{false};
   std::atomic<uint64_t> started_{0}, completed_{0}, failed_{0}, waiting_{0}, waitingBodyBytes_{0},
       displaced_{0}, refused_{0};
   int epoll_ = -1, wake_ = -1;
@@ -150,6 +155,7 @@ class URLNetwork {
   std::string curlProblem_;  // the last one that was logged
   WatchedSockets sockets_;
   std::vector<Command> taken_;
+  bool awaitedGone_ = false;              // those there were when they were cancelled; later ones are refused
   LinkedList<URLSessionState> sessions_;  // that have requests or connections
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
   Deadline slowRetry_;

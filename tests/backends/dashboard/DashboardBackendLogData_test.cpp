@@ -28,6 +28,7 @@ TEST_F(LogData, IsPostedAsOneArchive) {
   EXPECT_EQ(request.headers,
             (std::vector<std::pair<std::string, std::string>>{{"Content-Type", "application/octet-stream"}}));
   EXPECT_FALSE(request.timeout);
+  EXPECT_TRUE(request.isAwaited);
   const auto archived = unarchivedObject(request.body.view());
   ASSERT_TRUE(std::holds_alternative<Value>(archived));
   EXPECT_EQ(std::get<Value>(archived), Value(entries_));

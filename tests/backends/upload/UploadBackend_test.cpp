@@ -119,6 +119,7 @@ TEST_F(Upload, SendsTheWholeFileCompressed) {
             (std::vector<std::pair<std::string, std::string>>{{"Content-Type", "application/octet-stream"},
                                                               {"Content-Encoding", "gzip"}}));
   EXPECT_EQ(unzipped(request.body), "contents");
+  EXPECT_TRUE(request.isAwaited);
   EXPECT_TRUE(logged(LogLevel::normal, "UploadBackend(uploadFileAtPath): Uploading file /tmp/report.log"));
 }
 

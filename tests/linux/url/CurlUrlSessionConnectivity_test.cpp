@@ -171,6 +171,25 @@ TEST_F(CurlURLSessionConnectivity, IsCancelledWhileItWaits) {
   EXPECT_EQ(factory().figures().waitingBytes, 0u);
 }
 
+TEST_F(CurlURLSessionConnectivity, IsCancelledWhileItWaitsForTheNetworkAndAThreadForIt) {
+  auto urls = session(true);
+  Outcome awaited, plain;
+  URLRequest request = post(server_->url("/"), "awaited");
+  request.isAwaited = true;
+  urls->start(std::move(request), awaited.completion());
+  urls->start(post(server_->url("/"), "plain"), plain.completion());
+  ASSERT_TRUE(waitUntilWaiting(2));
+  factory().cancelAwaited();
+  ASSERT_TRUE(awaited.wait());
+  EXPECT_EQ(awaited.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(factory().figures().waiting, 1u);
+  EXPECT_EQ(factory().figures().waitingBytes, 5u);
+  ASSERT_TRUE(restoreRoute());
+  ASSERT_TRUE(plain.wait());
+  EXPECT_EQ(plain.status(), 200) << plain.errorText();
+  EXPECT_EQ(server_->requestCount(), 1u);
+}
+
 TEST_F(CurlURLSessionConnectivity, DropsTheOldestWhenTooMuchOfASessionWaits) {
   auto urls = session(true), other = session(true);
   Outcome unaffected;

@@ -1,5 +1,9 @@
 // What every implementation of the URL session port promises, tested on the real one and on the one in
 // memory.
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "platform/Limits.h"
 #include "platform/WorkerPool.h"
 #include "platform/fake/FakeUrlSession.h"
@@ -62,6 +66,11 @@ class URLSessionContract : public testing::Test {
     made.method = "POST";
     made.url = implementation_.url();
     made.body = Data(body);
+    return made;
+  }
+  URLRequest awaited(std::string_view body = "body") {
+    URLRequest made = request(body);
+    made.isAwaited = true;
     return made;
   }
   URLSessionFactory& factory() { return implementation_.factory(); }
@@ -147,6 +156,96 @@ TYPED_TEST(URLSessionContract, CancelsAllForGood) {
   EXPECT_EQ(after.errorCode(), kURLErrorCancelled);
   EXPECT_TRUE(this->drained());
   EXPECT_EQ(this->factory().figures().failed, 2u);
+}
+
+TYPED_TEST(URLSessionContract, CancelsWhatIsAwaitedForGoodAndNothingElse) {
+  auto urls = this->factory().create({}), other = this->factory().create({});
+  Outcome awaited, awaitedElsewhere, plain, lateAwaited, latePlain;
+  urls->start(this->awaited(), awaited.completion());
+  urls->start(this->request("plain"), plain.completion());
+  other->start(this->awaited(), awaitedElsewhere.completion());
+  this->factory().cancelAwaited();
+  ASSERT_TRUE(awaited.wait() && awaitedElsewhere.wait());
+  EXPECT_EQ(awaited.errorCode(), kURLErrorCancelled);
+  EXPECT_EQ(awaited.error()->domain, kKYTURLErrorDomain);
+  EXPECT_FALSE(awaited.data());
+  EXPECT_FALSE(awaited.response());
+  EXPECT_EQ(awaitedElsewhere.errorCode(), kURLErrorCancelled);
+  this->factory().cancelAwaited();
+  urls->start(this->awaited(), lateAwaited.completion());
+  ASSERT_TRUE(lateAwaited.wait());
+  EXPECT_EQ(lateAwaited.errorCode(), kURLErrorCancelled);
+  urls->start(this->request("late"), latePlain.completion());
+  EXPECT_FALSE(plain.isDone());
+  this->implementation_.answerAll();
+  ASSERT_TRUE(plain.wait() && latePlain.wait());
+  EXPECT_EQ(plain.body(), "plain");
+  EXPECT_EQ(latePlain.body(), "late");
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(this->factory().figures().failed, 3u);
+  EXPECT_EQ(awaited.calls(), 1);
+  EXPECT_EQ(lateAwaited.calls(), 1);
+}
+
+TYPED_TEST(URLSessionContract, RefusesWhatIsAwaitedEvenBeforeAnythingWasStarted) {
+  this->factory().cancelAwaited();
+  auto urls = this->factory().create({});
+  Outcome outcome;
+  urls->start(this->awaited(), outcome.completion());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  EXPECT_TRUE(this->drained());
+}
+
+// Threads that wait for one request after the other, as uploads do, while the shut-down begins.
+TYPED_TEST(URLSessionContract, LeavesNoThreadWaitingWhenAwaitedRequestsAreStartedMeanwhile) {
+  constexpr int kThreads = 8, kAfterwards = 5;
+  std::atomic<int> started{0}, wrong{0}, unanswered{0};
+  {
+    std::vector<std::jthread> threads;
+    for (int i = 0; i < kThreads; ++i) {
+      threads.emplace_back([&] {
+        auto urls = this->factory().create({});
+        for (int cancelled = 0; cancelled < kAfterwards; ++cancelled) {
+          Outcome outcome;
+          urls->start(this->awaited(), outcome.completion());
+          ++started;
+          // Nobody answers: only the cancelling ends the first, and nothing but a refusal the others.
+          if (!outcome.wait()) ++unanswered;
+          if (outcome.errorCode() != kURLErrorCancelled || outcome.calls() != 1) ++wrong;
+        }
+      });
+    }
+    EXPECT_TRUE(eventually([&] { return started > 0; }));
+    this->factory().cancelAwaited();
+  }
+  EXPECT_EQ(unanswered, 0);
+  EXPECT_EQ(wrong, 0);
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(this->factory().figures().failed, static_cast<uint64_t>(kThreads) * kAfterwards);
+}
+
+TYPED_TEST(URLSessionContract, CompletesOnceWhenAReplyAndTheCancellingRace) {
+  constexpr size_t kRequests = 40;
+  auto urls = this->factory().create({});
+  std::vector<Outcome> outcomes(kRequests);
+  for (Outcome& outcome : outcomes) urls->start(this->awaited(), outcome.completion());
+  {
+    const std::jthread answering([&] { this->implementation_.answerAll(); });
+    this->factory().cancelAwaited();
+  }
+  uint64_t replies = 0;
+  for (const Outcome& outcome : outcomes) {
+    ASSERT_TRUE(outcome.wait());
+    if (outcome.status() == 200)
+      ++replies;
+    else
+      EXPECT_EQ(outcome.errorCode(), kURLErrorCancelled);
+  }
+  EXPECT_TRUE(this->drained());
+  for (const Outcome& outcome : outcomes) EXPECT_EQ(outcome.calls(), 1);
+  EXPECT_EQ(this->factory().figures().completed, replies);
+  EXPECT_EQ(this->factory().figures().failed, kRequests - replies);
 }
 
 TYPED_TEST(URLSessionContract, RefusesWhatWouldMakeTooMuchOutstanding) {
