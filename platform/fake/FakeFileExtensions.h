@@ -20,6 +20,7 @@ class FakeFileExtensions final : public FileExtensions {
   bool grants = true;  // whether tokens are worth anything
   bool regular = true;
   bool readable = true;
+  bool removable = true;
   std::string contents = "contents";
 
   // What happened.
@@ -46,7 +47,7 @@ class FakeFileExtensions final : public FileExtensions {
     }
     [[nodiscard]] bool remove(std::string_view name) override {
       file_.removed.emplace_back(name);
-      return true;
+      return file_.removable;
     }
 
    private:

@@ -223,6 +223,31 @@ TEST_F(DashboardDelivery, AWalkMissesNoRecord) {
   EXPECT_TRUE(queued().empty());
 }
 
+TEST_F(DashboardDelivery, ARecordOfAnotherStateIsLeftAlone) {
+  ASSERT_NE(make(reliable()), nullptr);
+  send(1);
+  send(2);
+  backend_->messageQueue()[0]->setState(2);
+  tick(25);
+  EXPECT_EQ(queued(), (std::vector<uint16_t>{1}));
+  EXPECT_EQ(socket().sent.size(), 1u + 5u);
+  EXPECT_EQ(backend_->messageQueue()[0]->numberOfChecks(), 0);
+}
+
+TEST_F(DashboardDelivery, TheLastResortEndsReliableDeliveryToo) {
+  ASSERT_NE(make(profile({{"reliable", 5000}})), nullptr);  // too slow to give up before
+  send(1);
+  backend_->cleanup();
+  tick(1, 5000ms);
+  EXPECT_EQ(backend_->cleanupState(), 2);
+  tick(1, 9499ms);
+  EXPECT_TRUE(socket().open);
+  tick(1, 1ms);
+  EXPECT_FALSE(socket().open);
+  EXPECT_EQ(platform_.reactor.waitsFor(socket().descriptor), 0u);
+  EXPECT_EQ(platform_.timers.pending(), 0u);
+}
+
 TEST_F(DashboardDelivery, ACleanUpWithNothingPendingEndsEverythingAtOnce) {
   for (const Dictionary& how : {profile(), reliable()}) {
     ASSERT_NE(make(how), nullptr);

@@ -108,6 +108,9 @@ TEST_F(Dashboard, WithoutAnAddressOrAPortInItsProfileIsNotMade) {
   EXPECT_EQ(make(Dictionary{{"ip", "192.0.2.7"}}), nullptr);
   EXPECT_EQ(errors("DashboardBackend(initWithName): can't resolve server port"), 1u);
   EXPECT_EQ(platform_.sink.lines().size(), 3u);
+  EXPECT_EQ(make(Dictionary{}), nullptr);  // the address is looked for first
+  EXPECT_EQ(errors("DashboardBackend(initWithName): can't resolve server IP"), 3u);
+  EXPECT_EQ(platform_.sink.lines().size(), 4u);
   EXPECT_EQ(platform_.udpSockets.made(), 0u);
   EXPECT_EQ(platform_.timers.pending(), 0u);
 }
@@ -167,9 +170,21 @@ TEST_F(Dashboard, ThatCannotBindStaysUnreliable) {
   ASSERT_NE(make(reliable()), nullptr);
   EXPECT_EQ(errors("DashboardBackend(useReliableUDP): can't bind socket, 98"), 1u);
   EXPECT_FALSE(backend_->reliableUDP());
+  EXPECT_EQ(platform_.reactor.waitsFor(socket().descriptor), 0u);
   send(1);
   EXPECT_EQ(socket().sent.back().substr(62, 2), bytes({0, 0}));
   EXPECT_TRUE(queued().empty());
+}
+
+TEST_F(Dashboard, ThatCannotBindTicksAtThePeriodOfItsProfile) {
+  platform_.udpSockets.faults.bind = 98;
+  ASSERT_NE(make(profile({{"reliable", 40}})), nullptr);
+  platform_.udpSockets.faults.send = 105;
+  send(1);
+  tick(1, std::chrono::milliseconds(39));
+  EXPECT_EQ(socket().attempts, 1u);
+  tick(1, std::chrono::milliseconds(1));
+  EXPECT_EQ(socket().attempts, 2u);
 }
 
 TEST_F(Dashboard, ThatCannotListenIsReliableAllTheSame) {
@@ -301,6 +316,12 @@ TEST_F(Dashboard, SanitizesWhatItSends) {
   EXPECT_EQ(textOf({{"a", "x\ny"}}), " a=xy");
   EXPECT_EQ(textOf({{"a", ""}}), " a=empty");
   EXPECT_EQ(textOf({{"a", Dictionary{}}}), " a=null");
+}
+
+TEST_F(Dashboard, SendsKeysAsTheyAre) {
+  ASSERT_NE(make(profile()), nullptr);
+  EXPECT_EQ(textOf({{"a=\\b %s", "v"}}), " a=\\b %s=v");
+  EXPECT_EQ(textOf({{"", "v"}}), " =v");
 }
 
 // The text with its terminator has 1024 bytes.

@@ -133,6 +133,14 @@ TEST_F(Upload, ARepliesSuccessRemovesTheFile) {
                      "Json output: {\"status\":\"success\"}"));
 }
 
+TEST_F(Upload, AFileThatCannotBeRemovedIsUploadedAllTheSame) {
+  platform_.fileExtensions.removable = false;
+  answer(reply("success"));
+  EXPECT_TRUE(upload());
+  EXPECT_EQ(removed().size(), 1u);
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, "UploadBackend"), 0u);
+}
+
 TEST_F(Upload, AnyReplyWithoutThatWordKeepsTheFile) {
   for (const char* text : {"", "{}", "{\"status\":\"Success\"}", "succes"}) {
     backend_ = nullptr;
@@ -178,6 +186,7 @@ TEST_F(Upload, WithoutAPosterNothingIsSentAndItIsStillTrue) {
 TEST_F(Upload, WithoutAnAddressTheTokenIsNotConsumed) {
   backend().setUploadURL(std::nullopt);
   EXPECT_FALSE(upload());
+  EXPECT_TRUE(logged(LogLevel::normal, "UploadBackend(uploadFileAtPath): Uploading file /tmp/report.log"));
   EXPECT_TRUE(platform_.fileExtensions.tokens.empty());
 }
 
