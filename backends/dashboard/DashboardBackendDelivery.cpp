@@ -54,7 +54,7 @@ void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID e
 void DashboardBackend::processSocketRead() {
   networkProcQueue_->assertCurrent();
   if (socket_ == nullptr) return;
-  std::array<std::byte, DashboardDatagram::kSize> buffer;
+  std::array<std::byte, DashboardDatagram::kSize> buffer{};
   const int64_t received = socket_->receive(buffer);
   static_cast<void>(readSource_.rearm());
   // Nothing else of an acknowledgement is looked at, and what is too short to hold a number is none.

@@ -154,7 +154,7 @@ bool UploadBackend::post(ReportingSessionConnectivityInterface& poster, URLReque
   poster.postURLRequestWithCompletionHandler(
       std::move(request),
       [&](std::optional<Data> data, const std::optional<URLResponse>&, std::optional<Error> error) {
-        if (!error) reply = std::move(data);
+        reply = std::move(data);
         failure = std::move(error);
         answered.signal();
       });

@@ -87,6 +87,13 @@ TEST_F(SessionFlush, WithoutACompletionStillAsksTheBackEnds) {
   EXPECT_EQ(backend("httppost").flushCount, 1);
 }
 
+TEST_F(SessionFlush, IsLoggedByTheBackEndsNameAndItsResultByTheKey) {
+  auto fanIn = std::make_shared<FlushFanIn>(class_, nullptr, 1);
+  fanIn->backendFinished("key", "name", "result", std::nullopt);
+  EXPECT_TRUE(logged(LogLevel::debug, "internalFlushMessagesWithCompletion: name"));
+  EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[key -> flushMessages] result"});
+}
+
 TEST_F(SessionFlush, RacingAnswersCallTheCompletionOnce) {
   for (int round = 0; round < 50; ++round) {
     constexpr int kBackends = 4;

@@ -327,6 +327,18 @@ TEST_F(DashboardDelivery, TheLastResortComes9500MillisecondsAfterTheNextTick) {
   EXPECT_EQ(platform_.sink.count("clean up at myPeriodicTask"), 0u);
 }
 
+TEST_F(DashboardDelivery, TheLastResortIsTakenBackWhenNothingIsPendingAnyMore) {
+  ASSERT_NE(make(reliable()), nullptr);
+  send(1);
+  backend_->cleanup();
+  tick();
+  EXPECT_EQ(platform_.timers.pending(), 2u);
+  acknowledge(1);
+  tick();
+  EXPECT_FALSE(socket().open);
+  EXPECT_EQ(platform_.timers.pending(), 0u);
+}
+
 TEST_F(DashboardDelivery, ASecondCleanUpChangesNothing) {
   ASSERT_NE(make(reliable()), nullptr);
   backend_->cleanup();

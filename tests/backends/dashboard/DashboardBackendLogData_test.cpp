@@ -115,6 +115,28 @@ TEST_F(LogData, FailsWithTheErrorOfTheRequest) {
   EXPECT_EQ(platform_.counters.value(Reason::postFailed), 1u);
 }
 
+// Answers with whatever a test wants, one thing beside the other.
+class AnyPoster final : public ReportingSessionConnectivityInterface {
+ public:
+  AnyPoster(std::optional<Data> data, std::optional<Error> error)
+      : data_(std::move(data)), error_(std::move(error)) {}
+  void postURLRequestWithCompletionHandler(URLRequest, URLCompletion completion) override {
+    completion(data_, std::nullopt, error_);
+  }
+
+ private:
+  const std::optional<Data> data_;
+  const std::optional<Error> error_;
+};
+
+TEST_F(LogData, FailsWithAnErrorWhateverDataCameWithIt) {
+  const auto poster = std::make_shared<AnyPoster>(Data(std::string_view("https://logs")),
+                                                  Error{kKYTURLErrorDomain, 18, "cut off"});
+  backend_->setReportingSessionConnectivityDelegate(poster);
+  EXPECT_FALSE(backend_->uploadLogData(entries_));
+  EXPECT_EQ(errors("DashboardBackend(uploadLogData): Error uploading log data array (cut off)"), 1u);
+}
+
 TEST_F(LogData, FailsWithoutDataInTheReply) {
   poster_->data.reset();
   EXPECT_FALSE(backend_->uploadLogData(entries_));

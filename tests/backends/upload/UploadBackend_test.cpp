@@ -175,6 +175,22 @@ TEST_F(Upload, AFailedPostKeepsTheFileAndIsStillTrue) {
   EXPECT_EQ(platform_.counters.value(Reason::postFailed), 1u);
 }
 
+TEST_F(Upload, AReplyThatCameCountsWhateverErrorCameWithIt) {
+  answer([](URLCompletion& completion) {
+    completion(Data(std::string_view("success")), std::nullopt, Error{kKYTURLErrorDomain, 18, "cut off"});
+  });
+  EXPECT_TRUE(upload());
+  EXPECT_EQ(removed().size(), 1u);
+  EXPECT_EQ(platform_.sink.count("UploadBackend(uploadFileAtPath): post"), 0u);
+}
+
+TEST_F(Upload, AReplyWithoutDataAndErrorIsAFailedPost) {
+  answer([](URLCompletion& completion) { completion(std::nullopt, URLResponse(), std::nullopt); });
+  EXPECT_TRUE(upload());
+  EXPECT_TRUE(removed().empty());
+  EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): post (null)"));
+}
+
 TEST_F(Upload, WithoutAPosterNothingIsSentAndItIsStillTrue) {
   static_cast<void>(backend());
   poster_.reset();
@@ -238,7 +254,8 @@ TEST_F(Upload, AFileThatCannotBeCompressedIsRefused) {
 }
 
 TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
-  for (const char* url : {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "http://a b/"}) {
+  for (const char* url : {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "https://?a",
+                          "http://a b/", "http://a\x7f/", "://a/"}) {
     backend_ = nullptr;
     platform_.sink.clear();
     profile_.set("post_url", url);

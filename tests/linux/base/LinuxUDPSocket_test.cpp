@@ -97,7 +97,9 @@ TEST_F(LinuxUDPSocketTest, CountsWhatIsOpenAndClosesAtItsEnd) {
   auto first = open(), second = open();
   EXPECT_EQ(factory_.openSockets(), 2u);
   const int descriptor = first->descriptor();
-  EXPECT_GE(descriptor, 0);
+  ASSERT_GE(descriptor, 0);
+  EXPECT_EQ(::fcntl(descriptor, F_GETFD), FD_CLOEXEC);
+  EXPECT_NE(::fcntl(descriptor, F_GETFL) & O_NONBLOCK, 0);
   first.reset();
   EXPECT_EQ(factory_.openSockets(), 1u);
   EXPECT_EQ(::fcntl(descriptor, F_GETFD), -1);
