@@ -20,6 +20,8 @@ struct Limits {
   double idleExitSeconds = 30;                    // socket-activated and without a session
   double shutdownGraceSeconds = 5;                // from SIGTERM to cancelling what is left
 
+  friend bool operator==(const Limits&, const Limits&) = default;
+
   // Fixed.
   static constexpr int maxObjectDepth = 32;  // property lists and JSON: recursion
   static constexpr int maxIPCDepth = 64;     // the wire protocol's own: 32 arrays + 32 structs, and variants

@@ -20,6 +20,7 @@ struct Settings {
   std::vector<std::string> cellularInterfaces;  // glob patterns of interface names
   Limits limits;
   LogTarget logTarget = LogTarget::automatic;
+  friend bool operator==(const Settings&, const Settings&) = default;
 };
 
 }  // namespace kyt

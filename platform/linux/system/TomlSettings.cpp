@@ -145,6 +145,13 @@ std::variant<Settings, TomlError> parseSettings(std::string_view text, std::stri
   return settings;
 }
 
+std::vector<std::string> settingNames() {
+  std::vector<std::string> names;
+  for (const Setting& setting : kSettings)
+    names.push_back(std::string(setting.section) + "." + std::string(setting.key));
+  return names;
+}
+
 std::variant<Settings, TomlError> readSettings(const std::string& path) {
   auto text = readTomlText(path);
   if (auto* error = std::get_if<TomlError>(&text)) return std::move(*error);

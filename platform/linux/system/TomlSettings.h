@@ -5,6 +5,7 @@
 #include <string>
 #include <string_view>
 #include <variant>
+#include <vector>
 
 #include "platform/Settings.h"
 #include "platform/linux/system/Toml.h"
@@ -13,5 +14,7 @@ namespace kyt {
 
 [[nodiscard]] std::variant<Settings, TomlError> readSettings(const std::string& path);
 [[nodiscard]] std::variant<Settings, TomlError> parseSettings(std::string_view text, std::string_view name);
+// All keys that there are, as "section.key": what documentation is compared with.
+[[nodiscard]] std::vector<std::string> settingNames();
 
 }  // namespace kyt

@@ -1,0 +1,109 @@
+// The examples of the manual pages work: files are taken, commands and programs run beside a real daemon.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+
+#include "platform/linux/system/FlatToml.h"
+#include "platform/linux/system/LandlockConfinement.h"
+#include "platform/linux/system/TomlEntitlements.h"
+#include "platform/linux/system/TomlSettings.h"
+#include "tests/integration/StageFixture.h"
+#include "tests/tools/ManualText.h"
+
+namespace kyt {
+namespace {
+
+template <typename Result>
+void expectTaken(const Result& result) {
+  const auto* error = std::get_if<TomlError>(&result);
+  EXPECT_EQ(error, nullptr) << error->text;
+}
+
+TEST(ManualExamples, OfFilesAreTaken) {
+  expectTaken(parseSettings(exampleOf("kytreportingd.toml.5", "settings"), "settings"));
+  const auto grants =
+      parseEntitlements(exampleOf("kytreportingd-entitlements.5", "entitlements"), "entitlements");
+  expectTaken(grants);
+  EXPECT_EQ(std::get<EntitlementGrants>(grants).grants.size(), 2U);
+  EXPECT_TRUE(std::get<EntitlementGrants>(grants).problems.empty());
+  expectTaken(parseFlatToml(exampleOf("kytreportingd-device.toml.5", "device"), "device"));
+  expectTaken(parseFlatToml(exampleOf("kytreportingd-defaults.5", "defaults"), "defaults"));
+  const ProfileVariables variables = {{"CONFIG", "/c"}, {"SHARE", "/s"}, {"CA", "/a"},
+                                      {"STATE", "/t"},  {"LOGS", "/l"},  {"RUN", "/r"}};
+  expectTaken(parseProfile(exampleOf("kytreportingd-profile.5", "profile"), "profile", variables));
+}
+
+TEST(ManualOfTheProfile, NamesEachVariable) {
+  const Names variables = matchesIn(textOf("daemon/Daemon.cpp"), "\\{\"([A-Z]+)\", ");
+  EXPECT_GE(variables.size(), 7U);
+  EXPECT_EQ(matchesIn(itemsOf(sectionOf("kytreportingd-profile.5", "")), "\\$\\{([A-Z]+)\\}"), variables);
+}
+
+class ManualExamplesOnAStage : public StageTest {
+ protected:
+  void SetUp() override {
+    tools::Stage::Options options;
+    options.serverArguments = {"--udp-port", "0"};
+    lay(std::move(options));
+    putBag("cadmor", {entry("example")});
+    startDaemon();
+  }
+  // As typed in a shell that finds the programs, and where kytctl means the stage's daemon.
+  [[nodiscard]] ProgramRun shell(const std::string& commands) const {
+    const std::string prelude = "set -e\nPATH=" KYT_PROGRAMS ":$PATH\nexport KYTREPORTING_SOCKET='" +
+                                socket() + "'\ncd '" + stage_->folder() +
+                                "'\nkytctl() { command kytctl --root '" + stage_->folder() + "' \"$@\"; }\n";
+    return runProgram("sh", {"-c", prelude + commands});
+  }
+};
+
+TEST_F(ManualExamplesOnAStage, OfKytctlRun) {
+  const ProgramRun sent = shell(exampleOf("kytctl.1", "sh send"));
+  EXPECT_EQ(sent.text, "finished\n");
+  EXPECT_TRUE(arrive("client=example&method=1&status=2", 1)) << daemonLog();
+  const ProgramRun session = shell(exampleOf("kytctl.1", "sh session"));
+  EXPECT_EQ(session.status, 0) << session.text;
+  EXPECT_TRUE(arrive("client=example&method=10", 3)) << daemonLog();
+  const ProgramRun defaults = shell(exampleOf("kytctl.1", "sh defaults"));
+  EXPECT_EQ(defaults.status, 0) << defaults.text;
+  EXPECT_NE(defaults.text.find("environmentType = 2 (integer)\n"), std::string::npos) << defaults.text;
+}
+
+TEST_F(ManualExamplesOnAStage, OfTheStorebagRun) {
+  ASSERT_FALSE(tools::writeFile(stage_->folder() + "/dulvek.toml",
+                                exampleOf("kytreportingd-storebag.5", "storebag"), 0644));
+  const ProgramRun run = shell(exampleOf("kytreportingd-storebag.5", "sh storebag"));
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find("\"client\": \"example\""), std::string::npos) << run.text;
+  EXPECT_EQ(run.text.find("warning"), std::string::npos) << run.text;
+}
+
+TEST_F(ManualExamplesOnAStage, OfTheFeedRuns) {
+  const std::string port = std::to_string(stage_->udpPort());
+  const ProgramRun run = shell(
+      std::regex_replace(exampleOf("kytfeed.1", "sh feed"), std::regex("--port 4000"), "--port " + port));
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find(" key=value\n"), std::string::npos) << run.text;
+}
+
+// The compiler, the flags and the library of this build.
+TEST_F(ManualExamplesOnAStage, OfTheLibraryCompileAndReport) {
+  const std::pair<const char*, const char*> languages[] = {{"c", "c"}, {"cpp", "c++"}};
+  for (const auto& [name, language] : languages) {
+    const std::string source = stage_->folder() + "/example." + name, program = stage_->folder() + "/" + name;
+    ASSERT_FALSE(tools::writeFile(source, exampleOf("libkytreporting.3", name), 0644));
+    const std::string standard = std::string(language) == "c" ? "-std=c11" : "-std=c++20";
+    const ProgramRun compiled =
+        shell(std::string(KYT_CXX " " KYT_USER_FLAGS " -Wall -Wextra -Werror ") + standard + " -x " +
+              language + " -I" KYT_SOURCE_DIR "/client/include -I" KYT_SOURCE_DIR " " + source +
+              " -x none -L" KYT_LIBRARIES " -lkytreporting -Wl,-rpath," KYT_LIBRARIES " -o " + program);
+    ASSERT_EQ(compiled.status, 0) << compiled.text;
+    const ProgramRun run = shell(program);
+    EXPECT_EQ(run.status, 0) << run.text;
+    EXPECT_EQ(run.text, std::string(name) == "c" ? "live: httppost\n" : "");
+  }
+  EXPECT_TRUE(arrive("client=example&method=10&status=1", 2)) << daemonLog();
+}
+
+}  // namespace
+}  // namespace kyt
