@@ -72,6 +72,17 @@ TEST(KeyedArchive, WritesEveryOtherKind) {
   EXPECT_EQ(hexOf(Dictionary{{"b", 1}, {"a", Array{}}}), "a2616201616180");
 }
 
+// Beyond 2^53 not every whole number is a double.
+TEST(KeyedArchive, WritesDatesAsIntegersOnlyWhereTheyAreExact) {
+  EXPECT_EQ(hexOf(Date{9007199254740992.0}), "c11b0020000000000000");
+  EXPECT_EQ(hexOf(Date{-9007199254740992.0}), "c13b001fffffffffffff");
+  EXPECT_EQ(hexOf(Date{18014398509481984.0}), "c1fb4350000000000000");
+  EXPECT_EQ(hexOf(Date{1e300}), "c1fb7e37e43c8800759c");
+  EXPECT_EQ(hexOf(Date{-1e300}), "c1fbfe37e43c8800759c");
+  EXPECT_EQ(hexOf(Date{std::numeric_limits<double>::infinity()}), "c1fb7ff0000000000000");
+  EXPECT_EQ(hexOf(Date{std::numeric_limits<double>::quiet_NaN()}), "c1fb7ff8000000000000");
+}
+
 TEST(KeyedArchive, ReadsBackWhatItWrote) {
   Array items;
   for (int i = 0; i < 300; ++i)

@@ -35,6 +35,18 @@ TEST_F(DashboardDelivery, SendsFiveTimesInAllAndGivesUp) {
   for (const std::string& datagram : socket().sent) EXPECT_EQ(datagram, socket().sent[0]);
 }
 
+TEST_F(DashboardDelivery, TicksWithNothingToDoChangeNothing) {
+  for (const Dictionary& how : {profile(), reliable()}) {
+    ASSERT_NE(make(how), nullptr);
+    tick(50);
+    EXPECT_TRUE(socket().open);
+    EXPECT_EQ(platform_.timers.pending(), 1u);
+    EXPECT_TRUE(platform_.sink.lines().empty());
+    send(1);
+    EXPECT_EQ(socket().sent.size(), 1u);
+  }
+}
+
 TEST_F(DashboardDelivery, TicksEveryPeriodOfTheProfile) {
   ASSERT_NE(make(profile({{"reliable", "40"}})), nullptr);
   send(1);
