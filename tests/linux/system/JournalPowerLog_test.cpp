@@ -14,6 +14,7 @@
 #include "platform/Counters.h"
 #include "platform/linux/system/Files.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/DocumentBlock.h"
 
 namespace kyt {
 namespace {
@@ -29,7 +30,9 @@ TEST(JournalPowerLog, WritesAnEntryWhereThereIsAJournalAndCountsWhereThereIsNone
               }
               Counters counters;
               JournalPowerLog log(counters);
-              const Dictionary event{{"a", "x\ny"}, {"event", 3u}};
+              // The worked example of docs/WIRE-POWERLOG.md, as its back end hands it over.
+              const Dictionary event{
+                  {"note", "two\nlines"}, {"ratio", 0.25}, {"method", 2u}, {"respCode", 3u}, {"event", 4u}};
               log.registeredEvent(28, "Medsrv-KYT", event);
               if (counters.value(Reason::powerLogUnavailable) != 1) return "not counted";
               ::mkdir("/run/systemd", 0755);
@@ -46,8 +49,7 @@ TEST(JournalPowerLog, WritesAnEntryWhereThereIsAJournalAndCountsWhereThereIsNone
               if (counters.value(Reason::powerLogUnavailable) != 1) return "counted";
               return std::string(buffer, static_cast<size_t>(count > 0 ? count : 0));
             }),
-            "MESSAGE=Power-log event Medsrv-KYT of agent 28\nPRIORITY=6\nSYSLOG_IDENTIFIER=kytreportingd\n"
-            "KYT_AGENT=28\nKYT_EVENT=Medsrv-KYT\nKYT_DICTIONARY={\"a\":\"x\\ny\",\"event\":3}\n");
+            documentBlock("WIRE-POWERLOG.md", "text entry") + "\n");
 }
 
 }  // namespace
