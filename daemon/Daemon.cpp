@@ -12,6 +12,7 @@
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/StopSignals.h"
 #include "platform/linux/base/UnixSocket.h"
+#include "platform/linux/system/Capabilities.h"
 #include "platform/linux/system/DeletionBroker.h"
 #include "platform/linux/system/Files.h"
 #include "platform/linux/system/LandlockConfinement.h"
@@ -49,6 +50,12 @@ LandlockConfinement confinement(const Paths& paths, const Settings& settings) {
                               {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
 }
 
+// Only after the helpers were forked, which need what is given up here.
+std::optional<std::string> confine(const Paths& paths, const Settings& settings) {
+  if (const int error = giveUpCapabilities()) return "capabilities: " + errorText(error);
+  return confinement(paths, settings).enter(kServiceName);
+}
+
 // The socket that the service manager handed over, or one of our own.
 std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> listeningSocket(const Paths& paths) {
   auto activated = UnixSocketAcceptor::adoptActivated();
@@ -72,7 +79,6 @@ std::unique_ptr<ProgramInspector> programInspector(Log& log) {
 // users; without it they stay.
 std::unique_ptr<DeletionBroker> deletionBroker(Log& log) {
   auto started = DeletionBroker::start();
-  DeletionBroker::giveUpTakingUsers();
   if (const auto* error = std::get_if<std::string>(&started)) {
     log.error("main: Cannot remove files that were uploaded: %s", error->c_str());
     return nullptr;
@@ -137,7 +143,7 @@ int runDaemon(const DaemonOptions& options) {
   log.normal("startLogging: Daemon starts logging...");
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
-  if (const auto error = confinement(paths, settings).enter(kServiceName)) {
+  if (const auto error = confine(paths, settings)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
   }

@@ -130,6 +130,8 @@ DaemonServices::~DaemonServices() = default;
 
 void DaemonServices::resume() {
   listener_.resume();
+  if (const auto interval = Watchdog::requestedInterval())
+    watchdog_.emplace(*interval, *reactor_, workers_, &ServiceManager::alive);
 }
 
 // Requests, and datagrams that are still sent again, may outlive their session.

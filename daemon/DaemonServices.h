@@ -4,6 +4,7 @@
 
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "backend/BackendFactory.h"
@@ -42,6 +43,7 @@
 #include "platform/linux/system/TomlBundle.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "platform/linux/system/TomlUserDefaults.h"
+#include "platform/linux/system/Watchdog.h"
 #include "platform/linux/url/CurlUrlSession.h"
 #include "session/MessageLogFiles.h"
 #include "session/ReportingdSessionClass.h"
@@ -67,7 +69,7 @@ class DaemonServices {
   DaemonServices(const DaemonServices&) = delete;
   DaemonServices& operator=(const DaemonServices&) = delete;
 
-  // The listener takes connections from now on.
+  // The listener takes connections from now on, and a service manager that asked for it is told that the daemon lives.
   void resume();
   // The orderly end: refuses new work, ends every session on its queue, waits for outstanding requests, all
   // under one deadline, and ends all threads. Once, on the main thread.
@@ -119,6 +121,7 @@ class DaemonServices {
   LinuxProcessTransaction transaction_;
   ReportingdAgent agent_;
   DBusServer listener_;
+  std::optional<Watchdog> watchdog_;
 };
 
 }  // namespace kyt

@@ -2,16 +2,19 @@
 #pragma once
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <optional>
 #include <string>
 #include <vector>
@@ -62,6 +65,17 @@ class DaemonProcess {
   [[nodiscard]] bool logged(std::string_view text) const { return log().find(text) != std::string::npos; }
   void writeSettings(const std::string& text) { root_.write("etc/kytreportingd/kytreportingd.toml", text); }
   void setRoot(std::string root) { rootOption_ = std::move(root); }
+  // Runs in the new process, before the daemon does: for its environment, its user.
+  void setBeforeExecution(std::function<void()> work) { beforeExecution_ = std::move(work); }
+  // A program and its arguments in front of the daemon's.
+  void setLauncher(std::vector<std::string> launcher) { launcher_ = std::move(launcher); }
+  void setProgram(std::string program) { program_ = std::move(program); }
+  [[nodiscard]] pid_t process() const { return child_; }
+  // Waits until a client has connected to the socket that nobody serves yet.
+  [[nodiscard]] bool isWantedBySomeone() const {
+    pollfd waiting = {listening_, POLLIN, 0};
+    return ::poll(&waiting, 1, static_cast<int>(std::chrono::milliseconds(kTestDeadline).count())) == 1;
+  }
   // As a service manager does: the daemon gets a listening socket at its usual place.
   void activateBySocket() {
     std::filesystem::create_directories(root_ / "run/kytreportingd");
@@ -76,7 +90,8 @@ class DaemonProcess {
 
   void start(std::vector<std::string> arguments = {"--log-level", "debug"}) {
     arguments.insert(arguments.begin(),
-                     {KYT_DAEMON, "--root", rootOption_.empty() ? root_.path() : rootOption_});
+                     {program_, "--root", rootOption_.empty() ? root_.path() : rootOption_});
+    arguments.insert(arguments.begin(), launcher_.begin(), launcher_.end());
     std::vector<char*> raw;
     for (std::string& argument : arguments) raw.push_back(argument.data());
     raw.push_back(nullptr);
@@ -94,7 +109,8 @@ class DaemonProcess {
       else
         ::dup2(listening_, 3);
     }
-    ::execv(raw[0], raw.data());
+    if (beforeExecution_) beforeExecution_();
+    ::execvp(raw[0], raw.data());
     ::_exit(127);
   }
   [[nodiscard]] bool startAndWait() {
@@ -102,6 +118,11 @@ class DaemonProcess {
     return eventually([this] { return logged("main: Listener resumes with sandbox, start loop."); });
   }
   void terminate(int signal = SIGTERM) const { ::kill(child_, signal); }
+  [[nodiscard]] bool hasEnded() const {
+    siginfo_t state = {};
+    return ::waitid(P_PID, static_cast<id_t>(child_), &state, WEXITED | WNOHANG | WNOWAIT) != 0 ||
+           state.si_pid == child_;
+  }
   // Waits for the end. -1: ended by a signal.
   [[nodiscard]] int exitStatus() {
     int status = 0;
@@ -113,7 +134,9 @@ class DaemonProcess {
 
  private:
   TemporaryFolder root_;
-  std::string rootOption_;
+  std::string rootOption_, program_ = KYT_DAEMON;
+  std::vector<std::string> launcher_;
+  std::function<void()> beforeExecution_;
   pid_t child_ = 0;
   int listening_ = -1;
 };

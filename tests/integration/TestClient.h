@@ -63,6 +63,7 @@ class TestClient {
     return session_->sendMessage(category, type, std::move(payload), flag);
   }
   bool finish() { return session_->finish(std::chrono::seconds(20)); }
+  void close() { session_.reset(); }
   KYTReporting* operator->() { return session_.get(); }
 
   static std::string waitFor(const std::shared_ptr<std::promise<std::string>>& answer) {

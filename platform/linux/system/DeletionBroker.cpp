@@ -17,6 +17,7 @@
 #include <cstring>
 
 #include "platform/WorkerPool.h"
+#include "platform/linux/system/Capabilities.h"
 
 namespace kyt {
 namespace {
@@ -35,23 +36,10 @@ struct Request {
 
 // ---- In the broker: nothing below allocates or takes a lock.
 
-struct Capabilities {
-  __user_cap_header_struct header = {_LINUX_CAPABILITY_VERSION_3, 0};
-  __user_cap_data_struct data[2] = {};
-  bool read() { return ::syscall(SYS_capget, &header, data) == 0; }
-  bool write() { return ::syscall(SYS_capset, &header, data) == 0; }
-  void keep(uint32_t mask) {
-    data[0].permitted &= mask;
-    data[0].effective = data[0].permitted;
-    data[0].inheritable = 0;
-    data[1] = {};
-  }
-};
-constexpr uint32_t kTakingUsers = 1U << CAP_SETUID | 1U << CAP_SETGID;
+constexpr CapabilitySet kTakingUsers = capabilitySet(CAP_SETUID) | capabilitySet(CAP_SETGID);
 
 bool mayTakeUsers() {
-  Capabilities capabilities;
-  return capabilities.read() && (capabilities.data[0].effective & kTakingUsers) == kTakingUsers;
+  return (effectiveCapabilities() & kTakingUsers) == kTakingUsers;
 }
 
 // Leaves no capability, whoever this process was and is. 0 or errno.
@@ -65,10 +53,7 @@ int become(const Request& request) {
   uid_t real = 0, effective = 0, saved = 0;
   if (::getresuid(&real, &effective, &saved) != 0) return errno;
   if (real != request.user || effective != request.user || saved != request.user) return EPERM;
-  Capabilities capabilities;
-  if (!capabilities.read()) return errno;
-  capabilities.keep(0);
-  return capabilities.write() ? 0 : errno;
+  return keepCapabilities(0);
 }
 
 bool isName(const Request& request) {
@@ -131,10 +116,7 @@ Received receive(int socket, Request& request) {
   if (::chdir("/") != 0) ::_exit(1);
   if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
   ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
-  Capabilities capabilities;
-  if (!capabilities.read()) ::_exit(1);
-  capabilities.keep(kTakingUsers);
-  if (!capabilities.write()) ::_exit(1);
+  if (keepCapabilities(kTakingUsers) != 0) ::_exit(1);
   static Request request;
   while (true) {
     request = {};
@@ -223,15 +205,6 @@ int DeletionBroker::remove(int file, int folder, std::string_view name, const Pe
     if (!sendRequest(socket_.get(), *request, {file, folder, theirs.get()})) return errno != 0 ? errno : EIO;
   }
   return awaitAnswer(mine.get());
-}
-
-void DeletionBroker::giveUpTakingUsers() {
-  Capabilities capabilities;
-  if (!capabilities.read()) return;
-  capabilities.data[0].effective &= ~kTakingUsers;
-  capabilities.data[0].permitted &= ~kTakingUsers;
-  capabilities.data[0].inheritable &= ~kTakingUsers;
-  (void)capabilities.write();
 }
 
 }  // namespace kyt

@@ -39,9 +39,6 @@ class DeletionBroker {
   // Waits for the answer, some seconds at most.
   [[nodiscard]] int remove(int file, int folder, std::string_view name, const PeerIdentity& peer) const;
 
-  // From here on this process and its threads cannot take another user or group: that is the broker's alone.
-  static void giveUpTakingUsers();
-
  private:
   DeletionBroker(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
 

@@ -1,5 +1,6 @@
 #include "platform/linux/system/ProgramInspector.h"
 
+#include <linux/capability.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
@@ -12,6 +13,8 @@
 
 #include <cerrno>
 #include <cstdio>
+
+#include "platform/linux/system/Capabilities.h"
 
 namespace kyt {
 namespace {
@@ -39,6 +42,14 @@ Answer inspect(int32_t pid) {
   return answer;
 }
 
+// What looks at processes of other users. Where even root lacks that, a process must hold all that the one it looks
+// at does, so root then keeps what it has.
+CapabilitySet neededCapabilities() {
+  const CapabilitySet held = effectiveCapabilities();
+  constexpr CapabilitySet looking = capabilitySet(CAP_SYS_PTRACE);
+  return (held & looking) == 0 && ::geteuid() == 0 ? held : looking;
+}
+
 [[noreturn]] void serve(int socket) {
   // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
   ::signal(SIGINT, SIG_IGN);
@@ -47,11 +58,12 @@ Answer inspect(int32_t pid) {
   ::signal(SIGPIPE, SIG_IGN);
   ::prctl(PR_SET_NAME, "kyt-inspector");
   ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
+  ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
   if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
   ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
   // It may be allowed to look at every process; so it can open nothing, which a look does not need.
   const rlimit none = {0, 0};
-  if (::setrlimit(RLIMIT_NOFILE, &none) != 0) ::_exit(1);
+  if (::setrlimit(RLIMIT_NOFILE, &none) != 0 || keepCapabilities(neededCapabilities()) != 0) ::_exit(1);
   while (true) {
     int32_t pid = 0;
     const ssize_t count = ::recv(socket, &pid, sizeof pid, 0);

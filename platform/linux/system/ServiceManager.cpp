@@ -4,10 +4,14 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstddef>
 #include <cstdlib>
+#include <string_view>
 #include <utility>
 
 #include "platform/SerialQueue.h"
@@ -23,14 +27,38 @@ constexpr int kBestEffortClass = 2;  // IOPRIO_CLASS_BE
 constexpr int kUtilityPriority = 6;  // of 0 (first) to 7
 constexpr int kOfThread = 1;         // IOPRIO_WHO_PROCESS; 0 is the calling thread
 
-void tell(const std::string& state) {
-  if (std::getenv("NOTIFY_SOCKET") == nullptr) return;
-  const auto loaded = SystemdLibrary::load();
-  if (const auto* problem = std::get_if<std::string>(&loaded)) {
-    StderrSink().write(LogLevel::error, "ServiceManager(tell): cannot tell the service manager: " + *problem);
-    return;
-  }
-  (void)std::get<SystemdLibrary>(loaded).notify(0, state.c_str());
+constexpr timeval kPatience = {2, 0};  // with a service manager that does not listen
+
+// Where the service manager listens: a path, or "@" and an abstract name.
+bool fillNotifyAddress(std::string_view place, sockaddr_un& address, socklen_t& size) {
+  address = {};
+  address.sun_family = AF_UNIX;
+  if (place.size() < 2 || place.size() >= sizeof address.sun_path) return false;
+  if (!place.starts_with('/') && !place.starts_with('@')) return false;
+  place.copy(address.sun_path, place.size());
+  if (place.starts_with('@')) address.sun_path[0] = '\0';
+  size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + place.size() + (place[0] == '/' ? 1 : 0));
+  return true;
+}
+
+// Not with libsystemd: its function waits without end when nobody reads, and then nothing here would end in order.
+int tell(const std::string& state) {
+  const char* const place = std::getenv("NOTIFY_SOCKET");
+  if (place == nullptr) return 0;
+  sockaddr_un address;
+  socklen_t size = 0;
+  if (!fillNotifyAddress(place, address, size)) return EINVAL;
+  const FileHandle socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  if (!socket || ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience) != 0)
+    return errno;
+  const auto* const to = reinterpret_cast<const sockaddr*>(&address);
+  return ::sendto(socket.get(), state.data(), state.size(), MSG_NOSIGNAL, to, size) < 0 ? errno : 0;
+}
+
+void tellOrSay(const std::string& state) {
+  if (const int error = tell(state))
+    StderrSink().write(LogLevel::error,
+                       "ServiceManager(tell): cannot tell the service manager: " + errorText(error));
 }
 
 }  // namespace
@@ -56,15 +84,19 @@ std::variant<FileHandle, std::string> ServiceManager::takeListeningSocket() {
 }
 
 void ServiceManager::ready(const std::string& status) {
-  tell("READY=1\nSTATUS=" + escapedText(status));
+  tellOrSay("READY=1\nSTATUS=" + escapedText(status));
 }
 
 void ServiceManager::stopping() {
-  tell("STOPPING=1\nSTATUS=Stopping");
+  tellOrSay("STOPPING=1\nSTATUS=Stopping");
 }
 
 void ServiceManager::status(const std::string& status) {
-  tell("STATUS=" + escapedText(status));
+  tellOrSay("STATUS=" + escapedText(status));
+}
+
+void ServiceManager::alive() {
+  (void)tell("WATCHDOG=1");  // what is missed is missed: the next one follows
 }
 
 bool enterUtilityServiceClass() {

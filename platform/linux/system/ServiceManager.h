@@ -23,10 +23,12 @@ class ServiceManager {
   // text when what was handed over is not exactly one listening Unix stream socket. Answers the socket once;
   // the environment forgets it.
   [[nodiscard]] static std::variant<FileHandle, std::string> takeListeningSocket();
-  // Told over NOTIFY_SOCKET; nothing happens without one. `status` is one line for people.
+  // Told over NOTIFY_SOCKET; nothing happens without one. Waits two seconds at most when nobody reads there.
+  // `status` is one line for people.
   static void ready(const std::string& status);
   static void stopping();
   static void status(const std::string& status);
+  static void alive();  // Watchdog.h
 };
 
 // Makes the calling thread, and those it starts, give way to others: the utility class is a nice value of at

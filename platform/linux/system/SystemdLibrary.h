@@ -1,4 +1,4 @@
-// The functions of libsystemd, loaded only where there is a journal or a service manager to talk to: it and
+// The functions of libsystemd, loaded only where there is a journal or a handed-over socket: it and
 // the libraries it brings along would be a tenth of an idle daemon's memory elsewhere.
 #pragma once
 
@@ -16,7 +16,6 @@ struct SystemdLibrary {
 
   decltype(::sd_listen_fds)* listenDescriptors = nullptr;
   decltype(::sd_is_socket)* isSocket = nullptr;
-  decltype(::sd_notify)* notify = nullptr;
   decltype(::sd_journal_sendv)* journalSend = nullptr;
 };
 

@@ -12,7 +12,6 @@ TEST(SystemdLibrary, HasAllFunctions) {
   const auto& functions = std::get<SystemdLibrary>(loaded);
   EXPECT_NE(functions.listenDescriptors, nullptr);
   EXPECT_EQ(functions.isSocket(0, AF_UNIX, SOCK_SEQPACKET, 1), 0);
-  EXPECT_NE(functions.notify, nullptr);
   EXPECT_NE(functions.journalSend, nullptr);
 }
 
