@@ -136,6 +136,7 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
 
+  giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
   log.debug("main: At most %llu descriptors", static_cast<unsigned long long>(raiseDescriptorLimit()));

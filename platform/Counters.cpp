@@ -56,6 +56,8 @@ const char* reasonName(Reason reason) {
       return "hierarchy-token-refused";
     case Reason::uploadTooLarge:
       return "upload-too-large";
+    case Reason::tooMuchUploadedAtOnce:
+      return "too-much-uploaded-at-once";
     case Reason::customIdentifierRefused:
       return "custom-identifier-refused";
     case Reason::badUserDefaultsFile:

@@ -39,6 +39,7 @@ enum class Reason : uint8_t {
   sharedDataRefused,
   hierarchyTokenRefused,
   uploadTooLarge,
+  tooMuchUploadedAtOnce,  // a file refused since others of its user fill what may be in memory
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,

@@ -31,7 +31,11 @@ struct FileExtension {
   PeerIdentity peer = {};
 };
 
-enum class FileReadError : uint8_t { tooLarge, failed };
+enum class FileReadError : uint8_t {
+  tooLarge,
+  tooMuchAtOnce,  // of this user's files; later there may be room
+  failed
+};
 
 // What a consumed token gives. Released at destruction.
 class FileAccess {
@@ -40,8 +44,11 @@ class FileAccess {
   // A regular file that was opened for reading. Nothing else may be read; asking reads nothing.
   [[nodiscard]] virtual bool isReadableRegularFile() = 0;
   // The file from its beginning, as long as it is when reading begins: what is appended meanwhile is left out,
-  // what is cut off is missing. One longer than `maxBytes` is not read.
+  // what is cut off is missing. One longer than `maxBytes` is not read. What is read counts against what the
+  // client's user may have in memory at once, until the release.
   [[nodiscard]] virtual std::variant<Data, FileReadError> readWhole(uint64_t maxBytes) = 0;
+  // Of what was read only so many bytes are still held, in another form.
+  virtual void holdsOnly(uint64_t bytes) = 0;
   // Removes the folder's entry of that name with the rights of the client, provided that it is still this very
   // file.
   [[nodiscard]] virtual bool remove(std::string_view name) = 0;

@@ -32,12 +32,16 @@ struct Limits {
   // Requests started and not completed, each URL session: a server that answers slowly, or never, cannot make a
   // fast client fill the memory.
   static constexpr size_t maxOutstandingBytes = 64u << 20;
+  // Of one user's files, read and not yet answered: each of a user's many sessions may upload at the same time.
+  // One file is always taken.
+  static constexpr uint64_t maxUploadingBytesPerUser = 256u << 20;
   static constexpr size_t maxWorkers = 512;           // threads
   static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
   static constexpr double handshakeSeconds = 30;
   static constexpr size_t maxDescriptorsPerMessage = 16;
-  static constexpr unsigned turnCalls = 256;     // a connection hands its worker back after so many calls
-  static constexpr size_t turnBytes = 1u << 20;  // … or so many bytes
+  static constexpr unsigned turnCalls = 256;        // a connection hands its worker back after so many calls
+  static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
+  static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them
   static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };

@@ -2,6 +2,9 @@
 
 #include <cstdio>
 #include <string>
+#include <utility>
+
+#include "platform/Limits.h"
 
 namespace kyt {
 
@@ -30,7 +33,7 @@ void Log::error(const char* format, ...) {
 }
 
 void Log::debugObjects(const char* format, std::initializer_list<Value> objects) {
-  if (enabled(LogLevel::debug)) sink_->write(LogLevel::debug, formatObjects(format, objects));
+  if (enabled(LogLevel::debug)) writeLine(LogLevel::debug, formatObjects(format, objects));
 }
 
 void Log::write(LogLevel level, const char* format, va_list arguments) {
@@ -45,9 +48,21 @@ void Log::write(LogLevel level, const char* format, va_list arguments) {
   } else {
     std::string line(static_cast<size_t>(length), '\0');
     std::vsnprintf(line.data(), line.size() + 1, format, again);
-    sink_->write(level, line);
+    writeLine(level, std::move(line));
   }
   va_end(again);
+}
+
+void Log::writeLine(LogLevel level, std::string line) {
+  if (line.size() > Limits::maxLogLineBytes) {
+    const size_t whole = line.size();
+    size_t end = Limits::maxLogLineBytes;
+    // Not within a character.
+    for (int back = 0; back < 3 && (static_cast<unsigned char>(line[end]) & 0xC0) == 0x80; ++back) --end;
+    line.resize(end);
+    line.append(" (cut, ").append(std::to_string(whole)).append(" bytes in all)");
+  }
+  sink_->write(level, line);
 }
 
 }  // namespace kyt

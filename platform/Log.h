@@ -2,8 +2,9 @@
 // formats, checked by the compiler. Lines below the level in force cost one relaxed load.
 //
 // A `Log` may be called from any thread, never fails and never throws. What came from outside (a client's
-// name, a server's reply) may hold anything: the sinks escape control characters and invalid UTF-8. Owned by
-// the composition root; everyone else holds a reference.
+// name, a server's reply) may hold anything, at any length: the sinks escape control characters and invalid
+// UTF-8, and a line longer than Limits::maxLogLineBytes is cut there and says so. Owned by the composition
+// root; everyone else holds a reference.
 #pragma once
 
 #include <atomic>
@@ -52,6 +53,7 @@ class Log {
 
  private:
   void write(LogLevel level, const char* format, va_list arguments) __attribute__((format(printf, 3, 0)));
+  void writeLine(LogLevel level, std::string line);
   LogSink* sink_;
   std::atomic<int> level_;
 };

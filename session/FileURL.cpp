@@ -7,6 +7,8 @@ namespace kyt {
 
 namespace {
 
+constexpr size_t kLongestPath = 4095;  // of any file here; a longer one would only fill logs and requests
+
 int hexDigit(char c) {
   if (c >= '0' && c <= '9') return c - '0';
   if (c >= 'a' && c <= 'f') return c - 'a' + 10;
@@ -39,6 +41,7 @@ std::optional<String> pathOfFileURL(const String& url) {
     if (c == '\0') return std::nullopt;
     path.push_back(c);
   }
+  if (path.size() > kLongestPath) return std::nullopt;
   return String(path);
 }
 

@@ -14,6 +14,17 @@
 
 namespace kyt {
 
+namespace {
+
+// A client's text of any length must not fill the message log for all others: no URL of a file is longer.
+String shownURL(const String& url) {
+  constexpr size_t kLongest = 3 * 4096;
+  if (url.size() <= kLongest) return escapedText(url);
+  return escapedText(url.view().substr(0, kLongest)) + " (cut)";
+}
+
+}  // namespace
+
 void ReportingdSession::flushMessagesWithCompletion(ResultReply completion) {
   log().debug("flushMessagesWithCompletion: Flushing messages for session %u", _sessionID);
   internalFlushMessagesWithCompletion(std::move(completion));
@@ -60,7 +71,7 @@ void ReportingdSession::uploadFileWithURL(const String& fileURL, const String& e
   else
     log().error("uploadFileWithURL: File upload failed for %s", shownPath);
   class_.messageLog().writeToLogFile("[uploadFileWithURL] Upload %@ for file %@",
-                                     {success ? "succeeded" : "failed", escapedText(fileURL)});
+                                     {success ? "succeeded" : "failed", shownURL(fileURL)});
   if (completionHandler) completionHandler(success);
 }
 

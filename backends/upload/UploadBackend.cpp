@@ -15,6 +15,7 @@
 #include "platform/Platform.h"
 #include "platform/Semaphore.h"
 #include "platform/TextEscape.h"
+#include "platform/WorkerPool.h"
 
 namespace kyt {
 
@@ -123,13 +124,26 @@ std::optional<Data> UploadBackend::compressedFile(FileAccess& file) {
       log.error("UploadBackend(uploadFileAtPath): Input file is over the limit of %" PRIu64 " bytes", most);
     return std::nullopt;
   }
+  if (error != nullptr && *error == FileReadError::tooMuchAtOnce) {
+    if (platform_.counters.addAndMayLog(Reason::tooMuchUploadedAtOnce, platform_.clock.monotonic()))
+      log.error(
+          "UploadBackend(uploadFileAtPath): Input file refused, too much of its user is being uploaded");
+    return std::nullopt;
+  }
   // One that could not be read counts as empty.
   const Data* contents = std::get_if<Data>(&read);
   if (contents == nullptr || contents->empty()) {
     log.error("UploadBackend(uploadFileAtPath): Input file is empty");
     return std::nullopt;
   }
-  return gzipDeflate(platform_, contents->bytes());
+  std::optional<Data> body;
+  {
+    // A large file takes seconds: as long as a wait, and no reason for other sessions to stand in line.
+    const BlockingScope blocking;
+    body = gzipDeflate(platform_, contents->bytes());
+  }
+  file.holdsOnly(body ? body->size() : 0);
+  return body;
 }
 
 std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, Data body) const {

@@ -20,12 +20,14 @@ class FakeFileExtensions final : public FileExtensions {
   bool grants = true;  // whether tokens are worth anything
   bool regular = true;
   bool readable = true;
+  bool roomForMore = true;  // for this user
   bool removable = true;
   std::string contents = "contents";
 
   // What happened.
   std::vector<std::string> tokens, removed;
   std::atomic<int> held{0};  // accesses that are not released yet
+  uint64_t heldBytes = 0;    // that the last access said
 
   [[nodiscard]] std::unique_ptr<FileAccess> consume(std::string_view token,
                                                     std::optional<FileExtension>&) override {
@@ -43,8 +45,10 @@ class FakeFileExtensions final : public FileExtensions {
     [[nodiscard]] std::variant<Data, FileReadError> readWhole(uint64_t maxBytes) override {
       if (!file_.readable) return FileReadError::failed;
       if (file_.contents.size() > maxBytes) return FileReadError::tooLarge;
+      if (!file_.roomForMore) return FileReadError::tooMuchAtOnce;
       return Data(std::string_view(file_.contents));
     }
+    void holdsOnly(uint64_t bytes) override { file_.heldBytes = bytes; }
     [[nodiscard]] bool remove(std::string_view name) override {
       file_.removed.emplace_back(name);
       return file_.removable;

@@ -42,6 +42,7 @@ class FaultyStream : public DeflateStream {
   }
   int finish(std::span<const std::byte>& input, std::span<std::byte>& output) override {
     ++owner_.calls.finished;
+    if (owner_.faults.beforeFinish) owner_.faults.beforeFinish();
     if (owner_.faults.finish.empty()) return inner_->finish(input, output);
     const int result = owner_.faults.finish.front();
     owner_.faults.finish.pop_front();

@@ -7,6 +7,7 @@
 #include <optional>
 
 #include "platform/Deflate.h"
+#include "platform/Function.h"
 
 namespace kyt {
 
@@ -16,6 +17,7 @@ class FaultyDeflate : public Deflate {
     std::optional<int> initialize;  // the result of initialize(), which then does nothing else
     std::deque<int> finish;         // the results of the next calls of finish(), which then do nothing else
     std::optional<size_t> bound;    // what bound() answers
+    Function<void()> beforeFinish;  // called by each finish()
     const char* message = nullptr;  // what message() answers, if not null
     bool noStream = false;          // newStream() answers null
   };

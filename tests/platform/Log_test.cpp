@@ -4,6 +4,7 @@
 
 #include <string>
 
+#include "platform/Limits.h"
 #include "platform/fake/MemoryLogSink.h"
 
 namespace kyt {
@@ -36,16 +37,38 @@ TEST(Log, WritesNothingBelowItsLevel) {
   EXPECT_FALSE(log.debugEnabled());
 }
 
-TEST(Log, KeepsLinesOfAnyLengthWhole) {
+TEST(Log, KeepsLinesUpToTheLimitWhole) {
   MemoryLogSink sink;
   Log log(sink);
-  for (const size_t size : {1022U, 1023U, 1024U, 1025U, 100000U}) {
+  for (const size_t size :
+       {size_t{1022}, size_t{1023}, size_t{1024}, size_t{1025}, Limits::maxLogLineBytes - 1}) {
     sink.clear();
     const std::string text(size, 'x');
     log.error("%s%d", text.c_str(), 4);
     ASSERT_EQ(sink.lines().size(), 1U);
     EXPECT_EQ(sink.lines()[0].line, text + "4");
   }
+}
+
+TEST(Log, CutsALineOverTheLimitAndSaysSo) {
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::debug);
+  const std::string text(4u << 20, 'x');  // a server's whole reply
+  log.normal("%s", text.c_str());
+  log.debugObjects("%@", {String(text)});
+  ASSERT_EQ(sink.lines().size(), 2U);
+  const std::string cut = text.substr(0, Limits::maxLogLineBytes) + " (cut, 4194304 bytes in all)";
+  EXPECT_EQ(sink.lines()[0].line, cut);
+  EXPECT_EQ(sink.lines()[1].line, cut);
+}
+
+TEST(Log, CutsBetweenCharacters) {
+  MemoryLogSink sink;
+  Log log(sink);
+  const std::string before(Limits::maxLogLineBytes - 2, 'x');
+  log.normal("%s\xE2\x82\xAC and so on", before.c_str());  // a character of three bytes
+  ASSERT_EQ(sink.lines().size(), 1U);
+  EXPECT_EQ(sink.lines()[0].line, before + " (cut, 16395 bytes in all)");
 }
 
 TEST(Log, PrintsAMissingTextAsNull) {

@@ -115,7 +115,7 @@ TEST_F(SessionFlush, RacingAnswersCallTheCompletionOnce) {
 
 class SessionUpload : public SessionFixture {
  protected:
-  bool upload(const char* url) {
+  bool upload(const std::string& url) {
     std::optional<bool> success;
     client_.session->uploadFileAtPath(url, "token", std::nullopt, [&](bool s) { success = s; });
     EXPECT_TRUE(success.has_value());
@@ -152,6 +152,19 @@ TEST_F(SessionUpload, AClientsAddressCannotBeginALineOfTheMessageLog) {
       messageLog_.lines(),
       std::vector<std::string>{
           "[uploadFileWithURL] Upload failed for file file:///tmp/a\\n(2026-01-31 12:00:00 +0000) forged"});
+}
+
+TEST_F(SessionUpload, AnAddressTooLongForAnyFileIsAskedOfNobodyAndIsCutInTheMessageLog) {
+  configure({"uploadserver"});
+  backend("uploadserver").acceptsFiles = true;
+  const std::string longest = "/" + std::string(4094, 'x');
+  EXPECT_TRUE(upload("file://" + longest));
+  EXPECT_FALSE(upload("file://" + longest + "y"));
+  EXPECT_FALSE(upload("file:///" + std::string(900000, 'x')));
+  EXPECT_EQ(backend("uploadserver").uploadedPaths, std::vector<std::string>{longest});
+  ASSERT_EQ(messageLog_.lines().size(), 3u);
+  EXPECT_EQ(messageLog_.lines()[2],
+            "[uploadFileWithURL] Upload failed for file file:///" + std::string(12280, 'x') + " (cut)");
 }
 
 TEST_F(SessionUpload, FailsWhenNobodyAccepts) {

@@ -19,6 +19,9 @@ class LinuxFileExtensions::Access final : public FileAccess {
  public:
   Access(LinuxFileExtensions& owner, FileExtension extension)
       : owner_(owner), extension_(std::move(extension)) {}
+  ~Access() override { owner_.giveBack(extension_.peer.user, counted_); }
+  Access(const Access&) = delete;
+  Access& operator=(const Access&) = delete;
 
   [[nodiscard]] bool isReadableRegularFile() override {
     const BlockingScope blocking;
@@ -37,6 +40,9 @@ class LinuxFileExtensions::Access final : public FileAccess {
     const auto size = static_cast<uint64_t>(status.st_size);
     if (size > maxBytes) return FileReadError::tooLarge;
     if (size == 0) return Data();
+    holdsOnly(0);
+    if (!owner_.take(extension_.peer.user, size)) return FileReadError::tooMuchAtOnce;
+    counted_ = size;
     std::byte* bytes = nullptr;
     Data data = Data::uninitialized(size, bytes);
     size_t done = 0;
@@ -49,6 +55,12 @@ class LinuxFileExtensions::Access final : public FileAccess {
     }
     if (done < size) return Data(data.view().substr(0, done));
     return data;
+  }
+
+  void holdsOnly(uint64_t bytes) override {
+    if (bytes >= counted_) return;
+    owner_.giveBack(extension_.peer.user, counted_ - bytes);
+    counted_ = bytes;
   }
 
   [[nodiscard]] bool remove(std::string_view name) override {
@@ -67,7 +79,24 @@ class LinuxFileExtensions::Access final : public FileAccess {
 
   LinuxFileExtensions& owner_;
   const FileExtension extension_;
+  uint64_t counted_ = 0;
 };
+
+bool LinuxFileExtensions::take(uint32_t user, uint64_t bytes) {
+  const MutexLock lock(mutex_);
+  uint64_t& held = bytesOfUsers_[user];
+  if (held != 0 && (held > mostOfOneUser_ || bytes > mostOfOneUser_ - held)) return false;
+  held += bytes;
+  return true;
+}
+
+void LinuxFileExtensions::giveBack(uint32_t user, uint64_t bytes) {
+  if (bytes == 0) return;
+  const MutexLock lock(mutex_);
+  const auto found = bytesOfUsers_.find(user);
+  found->second -= bytes;
+  if (found->second == 0) bytesOfUsers_.erase(found);
+}
 
 std::unique_ptr<FileAccess> LinuxFileExtensions::consume(std::string_view token,
                                                          std::optional<FileExtension>& extension) {

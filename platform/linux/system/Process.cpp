@@ -1,5 +1,6 @@
 #include "platform/linux/system/Process.h"
 
+#include <malloc.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
@@ -39,6 +40,11 @@ uint64_t raiseDescriptorLimit() {
   if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return 0;
   limit.rlim_cur = std::max(limit.rlim_cur, std::min(limit.rlim_max, most));
   return ::setrlimit(RLIMIT_NOFILE, &limit) == 0 ? limit.rlim_cur : 0;
+}
+
+void giveLargeBlocksBack() {
+  constexpr int kLarge = 512 << 10;
+  (void)::mallopt(M_MMAP_THRESHOLD, kLarge);
 }
 
 }  // namespace kyt

@@ -247,6 +247,27 @@ TEST_F(Upload, AFileOverTheLimitIsRefusedAndCounted) {
             1u);
 }
 
+TEST_F(Upload, AFileOfAUserWhoseFilesFillTheMemoryIsRefusedAndCounted) {
+  platform_.fileExtensions.roomForMore = false;
+  EXPECT_FALSE(upload());
+  EXPECT_FALSE(upload());
+  EXPECT_TRUE(poster_->requests.empty());
+  EXPECT_TRUE(removed().empty());
+  EXPECT_EQ(platform_.counters.value(Reason::tooMuchUploadedAtOnce), 2u);
+  EXPECT_EQ(
+      platform_.sink.count(LogLevel::error,
+                           "UploadBackend(uploadFileAtPath): Input file refused, too much of its user is "
+                           "being uploaded"),
+      1u);
+}
+
+TEST_F(Upload, OnlyTheCompressedFileIsHeldWhileTheServerIsWaitedFor) {
+  platform_.fileExtensions.contents = std::string(100000, 'x');
+  EXPECT_TRUE(upload());
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(platform_.fileExtensions.heldBytes, poster_->requests[0].body.size());
+}
+
 TEST_F(Upload, AFileThatCannotBeCompressedIsRefused) {
   platform_.deflate.faults.initialize = -4;
   EXPECT_FALSE(upload());
@@ -294,6 +315,29 @@ TEST_F(Upload, BlocksItsWorkerUntilTheReplyAndLetsOthersRun) {
   released = true;
   EXPECT_TRUE(eventually([&] { return uploaded.load(); }));
   EXPECT_EQ(removed(), std::vector<std::string>{"report.log"});
+  pool.shutDown();
+}
+
+// A large file is compressed for seconds: with one worker that may run, another session's work does not wait
+// for it.
+TEST_F(Upload, LetsOthersRunWhileItCompresses) {
+  std::atomic<bool> compressing{false}, otherRan{false}, othersRanMeanwhile{false};
+  platform_.deflate.faults.beforeFinish = [&] {
+    compressing = true;
+    othersRanMeanwhile = eventually([&] { return otherRan.load(); });
+  };
+  answer(reply("success"));
+  static_cast<void>(backend());
+  WorkerPoolOptions options;
+  options.runnable = 1;
+  WorkerPool pool(options);
+  const auto uploads = SerialQueue::create("uploads", pool), others = SerialQueue::create("others", pool);
+  std::atomic<bool> uploaded{false};
+  uploads->async([&] { uploaded = upload(); });
+  ASSERT_TRUE(eventually([&] { return compressing.load(); }));
+  others->async([&] { otherRan = true; });
+  EXPECT_TRUE(eventually([&] { return uploaded.load(); }));
+  EXPECT_TRUE(othersRanMeanwhile);
   pool.shutDown();
 }
 

@@ -220,6 +220,35 @@ TEST_F(FileExtensionTest, AFileThatShrinksIsReadAsFarAsItIsThere) {
   EXPECT_TRUE(shrunk);
 }
 
+TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnceAndTheOnlyOneIsAlwaysRead) {
+  LinuxFileExtensions limited(broker_.get(), log_, counters_, 10);
+  auto accessOf = [&, files = 0](uint32_t user, const std::string& text) mutable {
+    const std::string path = folder_.write("f" + std::to_string(++files), text);
+    std::optional<FileExtension> given =
+        FileExtension{ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC)), folder(), {user, 0, {}}};
+    return limited.consume("token", given);
+  };
+  const auto refused = [](FileAccess& file) {
+    const auto read = file.readWhole(kPlenty);
+    const auto* error = std::get_if<FileReadError>(&read);
+    return error != nullptr && *error == FileReadError::tooMuchAtOnce;
+  };
+  auto large = accessOf(1, "more than ten bytes");
+  EXPECT_EQ(contents(*large), "more than ten bytes");
+  const auto small = accessOf(1, "1");
+  EXPECT_TRUE(refused(*small));
+  const auto ofAnother = accessOf(2, "1234567890");
+  EXPECT_EQ(contents(*ofAnother), "1234567890");
+  large.reset();
+  EXPECT_EQ(contents(*small), "1");
+  const auto next = accessOf(1, "123456789"), last = accessOf(1, "1");
+  EXPECT_EQ(contents(*next), "123456789");
+  EXPECT_EQ(contents(*next), "123456789") << "read again, it counts once";
+  EXPECT_TRUE(refused(*last));
+  next->holdsOnly(8);  // compressed
+  EXPECT_EQ(contents(*last), "1");
+}
+
 TEST_F(FileExtensionTest, WithoutABrokerNothingIsRemovedAndItIsCounted) {
   LinuxFileExtensions alone(nullptr, log_, counters_);
   auto given = extension(::open(folder_.write("a", "1").c_str(), O_RDONLY | O_CLOEXEC));
