@@ -64,12 +64,15 @@ void describe(CLI::App& app, Options& options, std::vector<std::string>& digestK
   app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)")
       ->allow_extra_args(false);
   app.add_option("--ready-file", options.readyFile, "Written when the ports are open: their numbers as JSON");
-  app.add_flag("--http-events", options.httpEvents, "Take event posts and log data on the plain port too");
+  app.add_flag("--http-events", options.httpEvents,
+               "Take event posts, log data and uploads on the plain port too");
   app.add_option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control")->capture_default_str();
   app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)")
       ->allow_extra_args(false);
-  app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post as sent")->capture_default_str();
-  app.add_option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON")->capture_default_str();
+  app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post, log data or an upload as sent")
+      ->capture_default_str();
+  app.add_option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON or an uploaded file")
+      ->capture_default_str();
   app.add_option("--request-timeout", options.requestTimeout, "Seconds for a request to be whole")
       ->check(CLI::Range(1, 3600))
       ->default_str("60");
