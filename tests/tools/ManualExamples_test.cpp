@@ -86,6 +86,20 @@ TEST_F(ManualExamplesOnAStage, OfTheFeedRuns) {
   EXPECT_NE(run.text.find(" key=value\n"), std::string::npos) << run.text;
 }
 
+// In the foreground, as the page says, until it is told to end.
+TEST_F(ManualExamplesOnAStage, OfTheDaemonRuns) {
+  std::string commands = exampleOf("kytreportingd.8", "sh daemon");
+  const std::string installed = "/usr/share/kytreporting";
+  commands.replace(commands.find(installed), installed.size(), KYT_SHARE "/kytreporting");
+  commands.pop_back();
+  commands +=
+      " & until [ -S root/run/kytreportingd/com.vantu.kytreportingd ]; do kill -0 $!; sleep 0.05; done\n"
+      "kill $!; wait $!\n";
+  const ProgramRun run = shell(commands);
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find("start loop"), std::string::npos) << run.text;
+}
+
 // The compiler, the flags and the library of this build.
 TEST_F(ManualExamplesOnAStage, OfTheLibraryCompileAndReport) {
   const std::pair<const char*, const char*> languages[] = {{"c", "c"}, {"cpp", "c++"}};

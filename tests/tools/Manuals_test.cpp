@@ -60,6 +60,16 @@ INSTANTIATE_TEST_SUITE_P(Programs, ManualOf,
                            return page.substr(0, page.find('.'));
                          });
 
+TEST(DevelopmentServersGuide, NamesEachOption) {
+  std::string rows;
+  const std::string guide = textOf("docs/DEVSERVER.md");
+  for (const std::string& line : linesOf(guide))
+    if (line.starts_with("| `--")) rows += line.substr(0, line.find('|', 1)) + "\n";
+  Names options = helpOf("kytdevserver").options;
+  for (const char* common : {"-h", "--help", "--version"}) options.erase(common);
+  EXPECT_EQ(matchesIn(rows, "`(--[a-z-]+)"), options);
+}
+
 TEST(ManualOfKytctl, NamesEachCommandWithItsOptions) {
   const Names everywhere{"-h", "--help", "--version", "--root"};
   const Help top = helpOf("kytctl");
