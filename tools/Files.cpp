@@ -12,6 +12,8 @@ namespace kyt::tools {
 
 namespace {
 
+constexpr size_t kMostBytes = 64u << 20;
+
 Error failure(const std::string& path) {
   return Error{"KYTToolsErrorDomain", errno, path + ": " + std::strerror(errno)};
 }
@@ -43,6 +45,12 @@ std::variant<std::string, Error> readFile(const std::string& path) {
     }
     if (got == 0) break;
     out.append(buffer, static_cast<size_t>(got));
+    if (out.size() > kMostBytes) {
+      errno = EFBIG;  // or a device without an end
+      Error error = failure(path);
+      close(fd);
+      return error;
+    }
   }
   close(fd);
   return out;

@@ -53,6 +53,14 @@ TEST_F(DashboardFeedProgram, SendsEachEventOnceAndPrintsItsLine) {
   EXPECT_EQ(eventNumbers(), (std::vector<int>{1, 2, 3}));
 }
 
+TEST_F(DashboardFeedProgram, AnEventCannotSteerTheTerminal) {
+  const ProgramRun run = feed({}, R"({"method":2,"respCode":3,"message":{"k":"\u001b[31m\u202e"}})"
+                                  "\nno \x1b[31m event\n");
+  EXPECT_EQ(run.status, 1);
+  EXPECT_NE(run.text.find("k=\\x1b[31m\\xe2\\x80\\xae\n"), std::string::npos) << run.text;
+  EXPECT_NE(run.text.find("kytfeed: no event: no \\x1b[31m event\n"), std::string::npos) << run.text;
+}
+
 // 5.004 is a little less as a binary number.
 TEST_F(DashboardFeedProgram, ATimeKeepsItsMilliseconds) {
   std::string lines;

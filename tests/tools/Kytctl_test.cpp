@@ -220,6 +220,29 @@ TEST_F(Kytctl, SignsVerifiesAndShowsAStorebag) {
   EXPECT_EQ(printed.text, folder_.read("document")) << "the same signature each time";
 }
 
+// A control sequence of 8 bits, one that turns text round, and a name that would be a line of its own.
+TEST_F(Kytctl, ABagCannotSteerTheTerminal) {
+  makeKeys();
+  const std::string bag = folder_.write(
+      "hostile.json",
+      R"({"version":"7\u009b31m","release":{"qrs\n\u202eforged":{"display_url":"\u2066x\u00e9"}}})");
+  ASSERT_EQ(sign(bag, folder_ / "document").status, 0);
+  const ProgramRun shown = run({"storebag", "show", folder_ / "document"});
+  EXPECT_EQ(shown.status, 0);
+  EXPECT_TRUE(has(shown.text, R"("version": "7\u009b31m")")) << shown.text;
+  EXPECT_TRUE(has(shown.text, R"("qrs\n\u202eforged": {)")) << shown.text;
+  EXPECT_TRUE(has(shown.text, "\"\\u2066x\xc3\xa9\"")) << shown.text;
+  const ProgramRun verified =
+      run({"storebag", "verify", folder_ / "document", "--public-key", folder_ / "keys/publicKey.der"});
+  EXPECT_TRUE(has(verified.text, "version 7\\xc2\\x9b31m\n")) << verified.text;
+}
+
+TEST_F(Kytctl, AFileWithoutAnEndIsGivenUp) {
+  const ProgramRun shown = run({"storebag", "show", "/dev/zero"});
+  EXPECT_EQ(shown.status, 1);
+  EXPECT_TRUE(has(shown.text, "File too large")) << shown.text;
+}
+
 TEST_F(Kytctl, SignsBagsInEachFormatAlike) {
   makeKeys();
   const std::string toml = folder_.write("bag.toml", "version = \"7\"\n[release.httppost]\n");

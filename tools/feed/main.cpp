@@ -19,6 +19,7 @@
 #include "platform/Platform.h"
 #include "platform/Semaphore.h"
 #include "platform/System.h"
+#include "platform/TextEscape.h"
 #include "platform/WorkerPool.h"
 #include "platform/linux/LinuxMemoryInfo.h"
 #include "platform/linux/LinuxRandom.h"
@@ -44,6 +45,8 @@ namespace {
 constexpr Duration kPoll = std::chrono::milliseconds(2);
 constexpr Duration kLongestEnd =
     std::chrono::seconds(30);  // the back end's own last resort comes far earlier
+
+constexpr size_t kLongestShown = 1024;  // of a line that is no event
 
 struct Options {
   std::string server, file = "-", selfVersion = "8.0", device = std::string(40, '0');
@@ -171,11 +174,11 @@ int feed(const Options& options, std::istream& in) {
     if (text.empty()) continue;
     const Value line = sendLine(machine, *backend, text, number);
     if (line.isNull()) {
-      std::fprintf(stderr, "kytfeed: no event: %s\n", text.c_str());
+      std::fprintf(stderr, "kytfeed: no event: %s\n", escapedText(text.substr(0, kLongestShown)).c_str());
       status = 1;
       break;
     }
-    std::puts(line.string()->c_str());
+    std::puts(escapedText(line.string()->view()).c_str());
     std::fflush(stdout);
     if (options.intervalMilliseconds > 0) pauseFor(std::chrono::milliseconds(options.intervalMilliseconds));
   }

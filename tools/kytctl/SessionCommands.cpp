@@ -92,7 +92,7 @@ int report(const std::shared_ptr<Answer>& answer, const ConnectionOptions& conne
   const auto said = answer->wait(connection.timeoutSeconds);
   if (!said) return failed(std::string(what) + ": no answer in time");
   if (said->second) return failed(std::string(what) + ": " + said->second->localizedDescription);
-  if (!said->first.empty()) std::printf("%s\n", said->first.c_str());
+  if (!said->first.empty()) std::printf("%s\n", escapedText(said->first).c_str());
   return 0;
 }
 
@@ -277,7 +277,7 @@ int sendCommand(const ConnectionOptions& connection, const SendOptions& given) {
   const auto said = answer->wait(connection.timeoutSeconds);
   if (!said) return failed("send: no answer in time");
   if (said->second) return failed("send: " + said->second->localizedDescription);
-  std::printf("%s\n", said->first.c_str());
+  std::printf("%s\n", escapedText(said->first).c_str());
   return said->first == "finished" ? 0 : 1;
 }
 
