@@ -15,7 +15,7 @@
 #include "platform/linux/system/Capabilities.h"
 #include "platform/linux/system/DeletionBroker.h"
 #include "platform/linux/system/Files.h"
-#include "platform/linux/system/LandlockConfinement.h"
+#include "platform/linux/system/LinuxConfinement.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/Process.h"
 #include "platform/linux/system/ProgramInspector.h"
@@ -39,21 +39,31 @@ std::optional<std::string> makeMissingFolders(const Paths& paths) {
   return std::nullopt;
 }
 
-LandlockConfinement confinement(const Paths& paths, const Settings& settings) {
-  return LandlockConfinement(paths.kytShare(),
-                             {{"CONFIG", paths.configuration()},
-                              {"SHARE", paths.kytShare()},
-                              {"PLUGINS", paths.plugIns()},
-                              {"STATE", paths.userDefaults()},
-                              {"LOGS", paths.messageLogs()},
-                              {"RUN", paths.run()},
-                              {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
+LinuxConfinement confinementOf(const Paths& paths, const Settings& settings) {
+  return LinuxConfinement(paths.kytShare(),
+                          {{"CONFIG", paths.configuration()},
+                           {"SHARE", paths.kytShare()},
+                           {"PLUGINS", paths.plugIns()},
+                           {"STATE", paths.userDefaults()},
+                           {"LOGS", paths.messageLogs()},
+                           {"RUN", paths.run()},
+                           {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
+}
+
+// What is confined less than the profile says, since the kernel is older than what it asks for.
+void logWhatIsNotEnforced(const LinuxConfinement& confinement, Log& log) {
+  for (const std::string& what : confinement.notEnforced())
+    log.normal("confinement: this kernel cannot %s", what.c_str());
+  if (!kernelTellsPeerProcess())
+    log.normal(
+        "confinement: this kernel cannot tell which process is connected (6.5 can): grants that name an "
+        "executable match nobody");
 }
 
 // Only after the helpers were forked, which need what is given up here.
-std::optional<std::string> confine(const Paths& paths, const Settings& settings) {
+std::optional<std::string> confine(Confinement& confinement) {
   if (const int error = giveUpCapabilities()) return "capabilities: " + errorText(error);
-  return confinement(paths, settings).enter(kServiceName);
+  return confinement.enter(kServiceName);
 }
 
 // The socket that the service manager handed over, or one of our own.
@@ -87,7 +97,7 @@ std::unique_ptr<DeletionBroker> deletionBroker(Log& log) {
 }
 
 int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspector& inspector,
-          const DeletionBroker* broker, StopSignals& stopSignals) {
+          const DeletionBroker* broker, Confinement& confinement, StopSignals& stopSignals) {
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -95,6 +105,10 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
   }
   auto& acceptor = std::get<std::unique_ptr<UnixSocketAcceptor>>(socket);
   const bool activated = acceptor->activated();
+  if (const auto error = confinement.endStart()) {
+    log.error("main: confine_init() fails: %s\n", error->c_str());
+    return kNotConfined;
+  }
   std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
   if (reactor == nullptr) {
     log.error("main: Cannot start the reactor");
@@ -139,16 +153,19 @@ int runDaemon(const DaemonOptions& options) {
   giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
-  log.debug("main: At most %llu descriptors", static_cast<unsigned long long>(raiseDescriptorLimit()));
   StopSignals stopSignals;
   log.normal("startLogging: Daemon starts logging...");
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
-  if (const auto error = confine(paths, settings)) {
+  LinuxConfinement confinement = confinementOf(paths, settings);
+  if (const auto error = confine(confinement)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
   }
-  return serve(settings, paths, log, *inspector, broker.get(), stopSignals);
+  logWhatIsNotEnforced(confinement, log);
+  log.debug("main: At most %llu descriptors",
+            static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
+  return serve(settings, paths, log, *inspector, broker.get(), confinement, stopSignals);
 }
 
 }  // namespace kyt

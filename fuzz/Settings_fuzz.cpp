@@ -8,8 +8,8 @@
 #include <string_view>
 
 #include "platform/TextEscape.h"
+#include "platform/linux/system/ConfinementProfile.h"
 #include "platform/linux/system/FlatToml.h"
-#include "platform/linux/system/LandlockConfinement.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "platform/linux/system/TomlSettings.h"
 

@@ -60,6 +60,8 @@ class Confinement {
  public:
   virtual ~Confinement() = default;
   [[nodiscard]] virtual std::optional<std::string> enter(std::string_view profileName) = 0;
+  // Once, when what only the start needs has been done: it is refused from now on. A value: an error's text.
+  [[nodiscard]] virtual std::optional<std::string> endStart() = 0;
 };
 
 }  // namespace kyt

@@ -18,12 +18,18 @@ class FakeConfinement final : public Confinement {
     entered_.emplace_back(profileName);
     return error_;
   }
+  [[nodiscard]] std::optional<std::string> endStart() override {
+    startEnded_ = true;
+    return error_;
+  }
+  [[nodiscard]] bool startEnded() const { return startEnded_; }
   // The profile names that were asked for, in order.
   [[nodiscard]] const std::vector<std::string>& entered() const { return entered_; }
 
  private:
   std::optional<std::string> error_;
   std::vector<std::string> entered_;
+  bool startEnded_ = false;
 };
 
 }  // namespace kyt

@@ -3,8 +3,8 @@
 
 #include <cstdlib>
 
+#include "platform/linux/system/ConfinementProfile.h"
 #include "platform/linux/system/FlatToml.h"
-#include "platform/linux/system/LandlockConfinement.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "platform/linux/system/TomlSettings.h"
 #include "tests/integration/StageFixture.h"

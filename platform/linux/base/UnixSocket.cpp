@@ -63,6 +63,17 @@ bool isLive(const sockaddr_un& address) {
 
 }  // namespace
 
+bool kernelTellsPeerProcess() {
+  int ends[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return false;
+  const Descriptor one = ownDescriptor(ends[0]), other = ownDescriptor(ends[1]);
+  int pidfd = -1;
+  socklen_t size = sizeof pidfd;
+  if (::getsockopt(one.get(), SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) != 0) return errno != ENOPROTOOPT;
+  const Descriptor process = ownDescriptor(pidfd);
+  return true;
+}
+
 StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) {
   iovec piece{buffer.data(), buffer.size()};
   alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * Limits::maxDescriptorsPerMessage)> control;

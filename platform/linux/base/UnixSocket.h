@@ -12,6 +12,9 @@
 
 namespace kyt {
 
+// Whether the kernel can say which process is at the other end (SO_PEERPIDFD, from Linux 6.5 on).
+[[nodiscard]] bool kernelTellsPeerProcess();
+
 class UnixStream final : public Stream {
  public:
   explicit UnixStream(Descriptor socket) : socket_(std::move(socket)) {}

@@ -1,10 +1,8 @@
 #include "platform/linux/system/Process.h"
 
 #include <malloc.h>
-#include <sys/resource.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <system_error>
 
@@ -31,15 +29,6 @@ std::string folderOf(const std::string& path) {
 
 uint32_t currentUser() {
   return ::geteuid();
-}
-
-uint64_t raiseDescriptorLimit() {
-  constexpr rlim_t most =
-      1 << 20;  // where the hard limit is none at all, tables of that size would be too large
-  rlimit limit = {};
-  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return 0;
-  limit.rlim_cur = std::max(limit.rlim_cur, std::min(limit.rlim_max, most));
-  return ::setrlimit(RLIMIT_NOFILE, &limit) == 0 ? limit.rlim_cur : 0;
 }
 
 void giveLargeBlocksBack() {

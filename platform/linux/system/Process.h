@@ -13,9 +13,6 @@ namespace kyt {
 // The folder that a file is in.
 [[nodiscard]] std::string folderOf(const std::string& path);
 [[nodiscard]] uint32_t currentUser();
-// Lets the process open as many descriptors as it may be allowed to, since service managers start programs
-// with a low limit that they may raise themselves. How many that are; 0 when the system refuses.
-[[nodiscard]] uint64_t raiseDescriptorLimit();
 // Large blocks (a file that is uploaded, a server's long reply) go back to the system when they are freed. Left to
 // itself the allocator keeps more and more of them, for each of its threads, after the first few.
 void giveLargeBlocksBack();

@@ -1,4 +1,4 @@
-#include "platform/linux/system/LandlockConfinement.h"
+#include "platform/linux/system/LandlockRules.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>
@@ -9,7 +9,6 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cstring>
@@ -37,35 +36,30 @@ int errorOf(int result) {
   return result == 0 ? 0 : errno;
 }
 
-// 0, or errno of binding a Unix socket there.
-int makeSocket(const std::string& path) {
-  const FileHandle socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  path.copy(address.sun_path, sizeof address.sun_path - 1);
-  return errorOf(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address));
-}
-
 std::string expectError(const char* what, int actual, int expected) {
   if (actual == expected) return "";
   return std::string(what) + ": " + std::to_string(actual) + " (" + std::strerror(actual) + "); ";
 }
 
-class LandlockConfinementTest : public testing::Test {
+class LandlockRulesTest : public testing::Test {
  protected:
   void SetUp() override {
     if (landlockVersion() < 1) GTEST_SKIP() << "this kernel has no Landlock";
-    folder_.write("profiles/test.profile", "read = ['${READ}', '/nonexistent']\nwrite = ['${WRITE}']\n");
     folder_.write("read/file", "r");
     folder_.write("write/file", "w");
     folder_.write("outside/file", "o");
   }
-  std::optional<std::string> enter(const std::string& name = "test") {
-    LandlockConfinement confinement(folder_ / "profiles", {{"READ", folder_ / "read"},
-                                                           {"WRITE", folder_ / "write"},
-                                                           {"MISSING", folder_ / "missing"},
-                                                           {"EMPTY", ""}});
-    return confinement.enter(name);
+  std::optional<std::string> enter(const ConfinementProfile& profile) {
+    auto rules = LandlockRules::of(profile, {});
+    if (const auto* error = std::get_if<std::string>(&rules)) return *error;
+    if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return "no_new_privs";
+    return std::get<LandlockRules>(rules).enter();
+  }
+  std::optional<std::string> enter() {
+    ConfinementProfile profile;
+    profile.read = {folder_ / "read", "/nonexistent"};
+    profile.write = {folder_ / "write"};
+    return enter(profile);
   }
   // Enters in a process of its own, then runs `work` there.
   std::string confined(const std::function<std::string()>& work) {
@@ -74,21 +68,10 @@ class LandlockConfinementTest : public testing::Test {
       return work();
     });
   }
-  // The error text of entering that profile, and that nothing was set up by the attempt.
-  std::string refusal(const std::string& profile) {
-    folder_.write("profiles/bad.profile", profile);
-    return inChildProcess([&]() -> std::string {
-      const auto error = enter("bad");
-      if (!error) return "entered";
-      if (::prctl(PR_GET_NO_NEW_PRIVS, 0, 0, 0, 0) != 0) return "no_new_privs is set";
-      if (openError(folder_ / "outside/file", O_RDWR) != 0) return "is confined";
-      return *error;
-    });
-  }
   TemporaryFolder folder_;
 };
 
-TEST_F(LandlockConfinementTest, ReadsAndWritesOnlyWhereTheProfileSays) {
+TEST_F(LandlockRulesTest, ReadsAndWritesOnlyWhereTheProfileSays) {
   EXPECT_EQ(
       confined([&] {
         std::string wrong;
@@ -107,7 +90,7 @@ TEST_F(LandlockConfinementTest, ReadsAndWritesOnlyWhereTheProfileSays) {
       "");
 }
 
-TEST_F(LandlockConfinementTest, MakesReplacesAndRemovesFilesInAWritableFolder) {
+TEST_F(LandlockRulesTest, MakesReplacesAndRemovesFilesInAWritableFolder) {
   EXPECT_EQ(confined([&] {
               const std::string made = folder_ / "write/new", file = folder_ / "write/file";
               std::string wrong;
@@ -125,7 +108,7 @@ TEST_F(LandlockConfinementTest, MakesReplacesAndRemovesFilesInAWritableFolder) {
             "");
 }
 
-TEST_F(LandlockConfinementTest, CutsNoFileThatMayOnlyBeRead) {
+TEST_F(LandlockRulesTest, CutsNoFileThatMayOnlyBeRead) {
   if (landlockVersion() < 3) GTEST_SKIP() << "this kernel's Landlock does not know truncation";
   EXPECT_EQ(confined([&] {
               return expectError("truncate", errorOf(::truncate((folder_ / "read/file").c_str(), 0)), EACCES);
@@ -134,7 +117,7 @@ TEST_F(LandlockConfinementTest, CutsNoFileThatMayOnlyBeRead) {
   EXPECT_EQ(folder_.read("read/file"), "r");
 }
 
-TEST_F(LandlockConfinementTest, RunsNoProgram) {
+TEST_F(LandlockRulesTest, RunsNoProgram) {
   std::filesystem::copy_file("/bin/true", folder_ / "read/program");
   EXPECT_EQ(confined([&] {
               const std::string program = folder_ / "read/program";
@@ -148,7 +131,7 @@ TEST_F(LandlockConfinementTest, RunsNoProgram) {
             "");
 }
 
-TEST_F(LandlockConfinementTest, HoldsForThreadsThatStartLater) {
+TEST_F(LandlockRulesTest, HoldsForThreadsThatStartLater) {
   EXPECT_EQ(confined([&] {
               int error = 0;
               std::thread([&] { error = openError(folder_ / "outside/file", O_RDONLY); }).join();
@@ -159,18 +142,7 @@ TEST_F(LandlockConfinementTest, HoldsForThreadsThatStartLater) {
             "");
 }
 
-TEST_F(LandlockConfinementTest, GivesUpPrivilegesAndCoreDumps) {
-  const int dumpable = LandlockConfinement::staysDumpable() ? 1 : 0;
-  EXPECT_EQ(confined([&] {
-              std::string wrong;
-              wrong += expectError("no_new_privs", ::prctl(PR_GET_NO_NEW_PRIVS, 0, 0, 0, 0), 1);
-              wrong += expectError("dumpable", ::prctl(PR_GET_DUMPABLE, 0, 0, 0, 0), dumpable);
-              return wrong;
-            }),
-            "");
-}
-
-TEST_F(LandlockConfinementTest, ConnectsToAnyTCPPortAndBindsNone) {
+TEST_F(LandlockRulesTest, ConnectsToAnyTCPPortAndBindsNone) {
   if (landlockVersion() < 4) GTEST_SKIP() << "this kernel's Landlock does not know TCP";
   const FileHandle server(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
   sockaddr_in address = {};
@@ -197,42 +169,21 @@ TEST_F(LandlockConfinementTest, ConnectsToAnyTCPPortAndBindsNone) {
       "");
 }
 
-TEST_F(LandlockConfinementTest, AMissingProfileIsAnError) {
-  EXPECT_EQ(inChildProcess([&] { return enter("none").value_or("entered"); }),
-            (folder_ / "profiles/none.profile") + ": No such file or directory");
-}
-
-TEST_F(LandlockConfinementTest, WhatIsWrongInAProfileIsAnErrorWithItsLine) {
-  const std::string file = folder_ / "profiles/bad.profile";
-  EXPECT_EQ(refusal("read = []\nexecute = ['/bin']\n"), file + ":2: unknown key \"execute\"");
-  EXPECT_EQ(refusal("read = '/etc'\n"), file + ":1: \"read\" must be an array of texts");
-  EXPECT_EQ(refusal("write = [\n 1 ]\n"), file + ":2: \"write\" must be an array of texts");
-  EXPECT_EQ(refusal("read = ['${HOME}/x']\n"), file + ":1: \"${HOME}/x\" names an unknown variable");
-  EXPECT_EQ(refusal("read = ['${HOME']\n"), file + ":1: \"${HOME\" has a variable without an end");
-  EXPECT_EQ(refusal("read = ['/a/${READ}']\n"), file + ":1: \"/a/${READ}\" has a variable in its middle");
-  EXPECT_EQ(refusal("read = ['etc']\n"), file + ":1: \"etc\" is no absolute path");
-  EXPECT_NE(refusal("read = [\n").find(file + ":"), std::string::npos);
-}
-
-TEST_F(LandlockConfinementTest, AWritablePathMustExist) {
-  EXPECT_EQ(refusal("write = ['${MISSING}']\n"), (folder_ / "missing") + ": No such file or directory");
-}
-
-TEST_F(LandlockConfinementTest, AnEntryOfAnEmptyVariableFallsAway) {
-  const auto profile =
-      std::get<ConfinementProfile>(parseProfile("read = ['${A}', '${B}/x']", "p", {{"A", ""}, {"B", "/b"}}));
-  EXPECT_EQ(profile.read, std::vector<std::string>{"/b/x"});
-  EXPECT_TRUE(profile.write.empty());
+TEST_F(LandlockRulesTest, AWritablePathMustExist) {
+  ConfinementProfile profile;
+  profile.write = {folder_ / "missing"};
+  EXPECT_EQ(enter(profile), (folder_ / "missing") + ": No such file or directory");
 }
 
 // Why the program inspector is a process of its own.
-TEST_F(LandlockConfinementTest, AskingWhatAProcessOutsideRunsNeedsTheInspector) {
+TEST_F(LandlockRulesTest, AskingWhatAProcessOutsideRunsNeedsTheInspector) {
   const int32_t outside = ::getpid();
+  ConfinementProfile proc;
+  proc.read = {"/proc"};
   EXPECT_EQ(inChildProcess([&]() -> std::string {
-              folder_.write("profiles/proc.profile", "read = ['/proc']\nwrite = []\n");
               auto inspector = ProgramInspectorProcess::start();
               if (const auto* error = std::get_if<std::string>(&inspector)) return *error;
-              if (auto error = enter("proc")) return *error;
+              if (auto error = enter(proc)) return *error;
               DirectProgramInspector direct;
               if (!std::holds_alternative<int>(direct.runningProgram(outside)))
                 return "a confined process could ask";
@@ -243,45 +194,6 @@ TEST_F(LandlockConfinementTest, AskingWhatAProcessOutsideRunsNeedsTheInspector) 
               return std::get<ProgramIdentity>(program) == ProgramIdentity{status.st_dev, status.st_ino}
                          ? ""
                          : "another";
-            }),
-            "");
-}
-
-TEST_F(LandlockConfinementTest, TheShippedProfileLetsTheDaemonWorkAndNoMore) {
-  for (const char* name : {"config", "share", "plugins", "state", "logs", "run", "ca"}) {
-    folder_.write(std::string(name) + "/file", "x");
-  }
-  EXPECT_EQ(inChildProcess([&]() -> std::string {
-              LandlockConfinement confinement(KYT_PACKAGING_SHARE, {{"CONFIG", folder_ / "config"},
-                                                                    {"SHARE", folder_ / "share"},
-                                                                    {"PLUGINS", folder_ / "plugins"},
-                                                                    {"STATE", folder_ / "state"},
-                                                                    {"LOGS", folder_ / "logs"},
-                                                                    {"RUN", folder_ / "run"},
-                                                                    {"CA", folder_ / "ca"}});
-              if (auto error = confinement.enter("com.vantu.kytreportingd")) return *error;
-              std::string wrong;
-              for (const char* name : {"config", "share", "plugins", "ca"}) {
-                const std::string file = folder_ / (std::string(name) + "/file");
-                wrong += expectError(name, openError(file, O_RDONLY), 0);
-                wrong += expectError(name, openError(file, O_WRONLY), EACCES);
-              }
-              wrong += expectError("socket", makeSocket(folder_ / "run/socket"), 0);
-              wrong += expectError("stale socket", errorOf(::unlink((folder_ / "run/socket").c_str())), 0);
-              wrong += expectError("socket elsewhere", makeSocket(folder_ / "state/socket"), EACCES);
-              for (const char* name : {"state", "logs"}) {
-                const std::string file = folder_ / (std::string(name) + "/file");
-                wrong += expectError(name, openError(file, O_RDWR), 0);
-                wrong += expectError(name, errorOf(::unlink(file.c_str())), 0);
-              }
-              for (const char* file :
-                   {"/etc/passwd", "/proc/self/status", "/proc/self/smaps_rollup", "/dev/urandom"}) {
-                wrong += expectError(file, openError(file, O_RDONLY), 0);
-              }
-              wrong += expectError("/etc", openError("/etc/kyt-must-not-be", O_WRONLY | O_CREAT), EACCES);
-              wrong += expectError("/tmp", openError(folder_ / "outside/file", O_RDONLY), EACCES);
-              wrong += expectError("/usr/bin/env", openError("/usr/bin/env", O_RDONLY), EACCES);
-              return wrong;
             }),
             "");
 }

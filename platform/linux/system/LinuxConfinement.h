@@ -1,0 +1,44 @@
+// Confinement by profile: what the process may do with files (LandlockRules), which system calls it may make
+// (SystemCallFilter), and how much it may take (limits), as a profile file says (ConfinementProfile).
+//
+// What is entered holds for the calling thread and those it starts, for ever, so it is entered before any
+// thread exists. The process also gives up gaining privileges (no_new_privs) and dumping core. There is no way
+// to run without it; what a build with a sanitizer leaves out stands in one table in the source.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/System.h"
+#include "platform/linux/system/ConfinementProfile.h"
+
+namespace kyt {
+
+class LinuxConfinement final : public Confinement {
+ public:
+  // `folder`: where the profiles are.
+  LinuxConfinement(std::string folder, ProfileVariables variables)
+      : folder_(std::move(folder)), variables_(std::move(variables)) {}
+  [[nodiscard]] std::optional<std::string> enter(std::string_view profileName) override;
+  [[nodiscard]] std::optional<std::string> endStart() override;
+
+  // What the profile asks and this kernel cannot do, known once entered; each ends "this kernel cannot …".
+  [[nodiscard]] const std::vector<std::string>& notEnforced() const { return notEnforced_; }
+  // Of this process, as the profile and what it was started with allow.
+  [[nodiscard]] static uint64_t descriptorLimit();
+  // True in builds with a sanitizer.
+  [[nodiscard]] static bool staysDumpable();
+  // False in builds with a sanitizer, which reserves more address space than there is memory.
+  [[nodiscard]] static bool limitsAddressSpace();
+
+ private:
+  const std::string folder_;
+  const ProfileVariables variables_;
+  SystemCallProfile systemCalls_;
+  std::vector<std::string> notEnforced_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,118 @@
+// The kernel's constants that profiles may name in a system call's arguments. One place, since the next
+// profile's constant is a line here.
+#pragma once
+
+#include <fcntl.h>
+#include <linux/netlink.h>
+#include <net/if.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sched.h>
+#include <sys/ioctl.h>
+#include <sys/mman.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+
+#include <cstdint>
+#include <string_view>
+
+namespace kyt {
+
+struct SystemCallConstant {
+  std::string_view name;
+  uint64_t value;
+};
+
+#define KYT_CONSTANT(name) \
+  { #name, static_cast < uint32_t>(name) }
+inline constexpr SystemCallConstant kSystemCallConstants[] = {
+    // sockets
+    KYT_CONSTANT(AF_UNIX),
+    KYT_CONSTANT(AF_INET),
+    KYT_CONSTANT(AF_INET6),
+    KYT_CONSTANT(AF_NETLINK),
+    KYT_CONSTANT(SOCK_STREAM),
+    KYT_CONSTANT(SOCK_DGRAM),
+    KYT_CONSTANT(SOCK_RAW),
+    KYT_CONSTANT(SOCK_SEQPACKET),
+    KYT_CONSTANT(SOCK_CLOEXEC),
+    KYT_CONSTANT(SOCK_NONBLOCK),
+    KYT_CONSTANT(NETLINK_ROUTE),
+    KYT_CONSTANT(IPPROTO_IP),
+    KYT_CONSTANT(IPPROTO_TCP),
+    KYT_CONSTANT(IPPROTO_UDP),
+    KYT_CONSTANT(IPPROTO_IPV6),
+    KYT_CONSTANT(SOL_SOCKET),
+    KYT_CONSTANT(SOL_NETLINK),
+    KYT_CONSTANT(SO_BINDTODEVICE),
+    KYT_CONSTANT(SO_KEEPALIVE),
+    KYT_CONSTANT(SO_PASSCRED),
+    KYT_CONSTANT(SO_RCVBUF),
+    KYT_CONSTANT(SO_RCVTIMEO),
+    KYT_CONSTANT(SO_SNDBUF),
+    KYT_CONSTANT(SO_SNDTIMEO),
+    KYT_CONSTANT(IP_RECVERR),
+    KYT_CONSTANT(IP_MTU_DISCOVER),
+    KYT_CONSTANT(IPV6_RECVERR),
+    KYT_CONSTANT(IPV6_V6ONLY),
+    KYT_CONSTANT(IPV6_MTU_DISCOVER),
+    KYT_CONSTANT(TCP_NODELAY),
+    KYT_CONSTANT(TCP_KEEPIDLE),
+    KYT_CONSTANT(TCP_KEEPINTVL),
+    KYT_CONSTANT(TCP_KEEPCNT),
+    KYT_CONSTANT(TCP_USER_TIMEOUT),
+    // memory
+    KYT_CONSTANT(PROT_READ),
+    KYT_CONSTANT(PROT_WRITE),
+    KYT_CONSTANT(PROT_EXEC),
+    KYT_CONSTANT(MAP_PRIVATE),
+    KYT_CONSTANT(MAP_ANONYMOUS),
+    KYT_CONSTANT(MFD_CLOEXEC),
+    KYT_CONSTANT(MFD_ALLOW_SEALING),
+    // files
+    KYT_CONSTANT(O_TRUNC),
+    KYT_CONSTANT(F_DUPFD),
+    KYT_CONSTANT(F_DUPFD_CLOEXEC),
+    KYT_CONSTANT(F_GETFD),
+    KYT_CONSTANT(F_SETFD),
+    KYT_CONSTANT(F_GETFL),
+    KYT_CONSTANT(F_SETFL),
+    KYT_CONSTANT(F_GETLK),
+    KYT_CONSTANT(F_SETLK),
+    KYT_CONSTANT(F_SETLKW),
+    KYT_CONSTANT(F_OFD_GETLK),
+    KYT_CONSTANT(F_OFD_SETLK),
+    KYT_CONSTANT(F_OFD_SETLKW),
+    KYT_CONSTANT(F_ADD_SEALS),
+    KYT_CONSTANT(F_GET_SEALS),
+    KYT_CONSTANT(FIONREAD),
+    KYT_CONSTANT(FIONBIO),
+    KYT_CONSTANT(TCGETS),
+    KYT_CONSTANT(SIOCGIFNAME),
+    KYT_CONSTANT(SIOCGIFINDEX),
+    KYT_CONSTANT(SIOCGIFFLAGS),
+    // threads and processes
+    KYT_CONSTANT(CLONE_VM),
+    KYT_CONSTANT(CLONE_FS),
+    KYT_CONSTANT(CLONE_FILES),
+    KYT_CONSTANT(CLONE_SIGHAND),
+    KYT_CONSTANT(CLONE_THREAD),
+    KYT_CONSTANT(CLONE_PTRACE),
+    KYT_CONSTANT(CLONE_VFORK),
+    KYT_CONSTANT(CLONE_UNTRACED),
+    KYT_CONSTANT(CLONE_NEWCGROUP),
+    KYT_CONSTANT(CLONE_NEWIPC),
+    KYT_CONSTANT(CLONE_NEWNET),
+    KYT_CONSTANT(CLONE_NEWNS),
+    KYT_CONSTANT(CLONE_NEWPID),
+    KYT_CONSTANT(CLONE_NEWUSER),
+    KYT_CONSTANT(CLONE_NEWUTS),
+    KYT_CONSTANT(PR_SET_NAME),
+    KYT_CONSTANT(PR_GET_NAME),
+    {"PR_SET_VMA", 0x53564d41},  // the allocator names its memory; younger than some headers
+    KYT_CONSTANT(PR_GET_DUMPABLE),
+    KYT_CONSTANT(PR_SET_PTRACER),
+};
+#undef KYT_CONSTANT
+
+}  // namespace kyt
