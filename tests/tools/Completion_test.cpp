@@ -1,4 +1,4 @@
-// What bash and zsh complete is what the programs' help names.
+// What bash, zsh and fish complete is what the programs' help names.
 #include <gtest/gtest.h>
 
 #include "tests/tools/ManualText.h"
@@ -52,9 +52,24 @@ class Zsh final : public Shell {
   }
 };
 
+class Fish final : public Shell {
+ public:
+  [[nodiscard]] bool isInstalled() const override { return kyt::isInstalled("fish"); }
+  // It has a command that answers what its tab key would, each with a tab and a description.
+  [[nodiscard]] ProgramRun complete(const std::string& line) const override {
+    const std::string program = line.substr(0, line.find(' '));
+    return runProgram(
+        "sh", {"-c",
+               kWithPrograms +
+                   "fish --no-config -c 'source $argv[1]; complete -C $argv[2]' \"$@\" 2>/dev/null | cut -f1",
+               "sh", kFolder + "/fish/" + program + ".fish", line});
+  }
+};
+
 const Bash kBash("");
 const Bash kBashWithItsPackage("source /usr/share/bash-completion/bash_completion || exit 1\n");
 const Zsh kZsh;
+const Fish kFish;
 
 struct Kind {
   const char* name;
@@ -119,7 +134,10 @@ TEST_P(Completion, KnowsFilesAndFolders) {
   std::filesystem::create_directories(folder_.path() + "/bags");
   const auto ends = [](const Names& words) {
     Names last;
-    for (const std::string& word : words) last.insert(word.substr(word.rfind('/') + 1));
+    for (std::string word : words) {
+      if (word.ends_with('/')) word.pop_back();
+      last.insert(word.substr(word.rfind('/') + 1));
+    }
     return last;
   };
   const std::string begin = folder_.path() + "/ba";
@@ -130,8 +148,8 @@ TEST_P(Completion, KnowsFilesAndFolders) {
 
 INSTANTIATE_TEST_SUITE_P(Shells, Completion,
                          ::testing::Values(Kind{"bash", kBash},
-                                           Kind{"bashWithItsPackage", kBashWithItsPackage},
-                                           Kind{"zsh", kZsh}),
+                                           Kind{"bashWithItsPackage", kBashWithItsPackage}, Kind{"zsh", kZsh},
+                                           Kind{"fish", kFish}),
                          [](const auto& test) { return std::string(test.param.name); });
 
 }  // namespace

@@ -1,0 +1,98 @@
+# fish completion for kytctl.
+
+# The words before the cursor that are neither options nor their values.
+function __kytctl_words
+    set -l value 0
+    for word in (commandline -opc)[2..-1]
+        if test $value = 1
+            set value 0
+        else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
+                --payload --user-info --type --bits --key -o --output --public-key
+            set value 1
+        else if not string match -q -- '-*' $word
+            echo $word
+        end
+    end
+end
+
+# Whether the command so far is exactly this, or begins with it (-b).
+function __kytctl_at
+    set -l words (__kytctl_words)
+    if test "$argv[1]" = -b
+        set -l wanted $argv[2..-1]
+        test (count $words) -ge (count $wanted); and test "$words[1..$(count $wanted)]" = "$wanted"
+    else
+        test "$words" = "$argv"
+    end
+end
+
+function __kytctl_root
+    set -l next 0
+    for word in (commandline -opc)
+        if test $next = 1
+            echo $word
+            return
+        end
+        test $word = --root; and set next 1
+    end
+end
+
+function __kytctl_domains
+    set -l root (__kytctl_root)
+    set -l domains com.vantu.kytreporting com.vantu.diagnostics com.vantu.timed
+    for file in $root/var/lib/kytreportingd/defaults/*.toml
+        set -a domains (string replace -r '.*/(.*)\.toml$' '$1' -- $file)
+    end
+    printf '%s\n' $domains | sort -u
+end
+
+function __kytctl_keys
+    kytctl --root "$(__kytctl_root)" defaults read (__kytctl_words)[3] 2>/dev/null | string replace -r ' = .*' ''
+end
+
+# Whether a word of that number is due behind a command of two words.
+function __kytctl_due
+    set -l words (__kytctl_words)
+    test (count $words) = (math 1 + $argv[1]); and contains -- "$words[1] $words[2]" $argv[2..-1]
+end
+
+complete -c kytctl -f
+complete -c kytctl -s h -l help -d 'Print help and exit'
+complete -c kytctl -n __kytctl_at -l version -d 'Print the version and exit'
+complete -c kytctl -l root -x -a '(__fish_complete_directories)' -d 'A folder in front of every fixed path'
+
+complete -c kytctl -n __kytctl_at -a send -d 'Send one event'
+complete -c kytctl -n __kytctl_at -a session -d 'Run a scripted session'
+complete -c kytctl -n __kytctl_at -a defaults -d 'Read and change user defaults'
+complete -c kytctl -n __kytctl_at -a consent -d 'The consent of the owner'
+complete -c kytctl -n __kytctl_at -a keys -d 'Keys for signing storebags'
+complete -c kytctl -n __kytctl_at -a storebag -d 'Signed configurations'
+complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'
+complete -c kytctl -n '__kytctl_at consent' -a 'show grant withdraw'
+complete -c kytctl -n '__kytctl_at keys' -a make
+complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show'
+
+for command in send session
+    complete -c kytctl -n "__kytctl_at -b $command" -l socket -r -F -d 'The socket of the daemon'
+    complete -c kytctl -n "__kytctl_at -b $command" -l timeout -x -d 'Seconds to wait for the daemon'
+end
+complete -c kytctl -n '__kytctl_at -b send' -l client-type -x -d 'The client type, 0 to 23'
+complete -c kytctl -n '__kytctl_at -b send' -l session-id -x -d 'The session ID'
+complete -c kytctl -n '__kytctl_at -b send' -l client-version -x -d 'The client version'
+complete -c kytctl -n '__kytctl_at -b send' -l category -x -d 'The category of the event'
+complete -c kytctl -n '__kytctl_at -b send' -l type -x -d 'The type of the event'
+complete -c kytctl -n '__kytctl_at -b send' -l payload -x -d 'A JSON object'
+complete -c kytctl -n '__kytctl_at -b send' -l user-info -x -d 'A JSON object'
+complete -c kytctl -n '__kytctl_at -b send' -l require-user-info -d 'The session promises user information'
+complete -c kytctl -n '__kytctl_at session' -F
+complete -c kytctl -n '__kytctl_at -b defaults write' -l type -x -a 'string integer real boolean' -d 'What the value is'
+complete -c kytctl -n '__kytctl_due 1 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_domains)'
+complete -c kytctl -n '__kytctl_due 2 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_keys)'
+complete -c kytctl -n '__kytctl_at -b keys make' -l bits -x -d 'Length of the key, 2048 to 16384'
+complete -c kytctl -n '__kytctl_at keys make' -a '(__fish_complete_directories)'
+complete -c kytctl -n '__kytctl_at -b storebag sign' -l key -r -F -d 'The private key'
+complete -c kytctl -n '__kytctl_at -b storebag sign' -s o -l output -r -F -d 'The document'
+for command in verify show
+    complete -c kytctl -n "__kytctl_at -b storebag $command" -l public-key -r -F -d 'The public key'
+end
+complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show"' -F

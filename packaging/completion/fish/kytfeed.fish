@@ -1,0 +1,13 @@
+# fish completion for kytfeed.
+complete -c kytfeed -s h -l help -d 'Print help and exit'
+complete -c kytfeed -l version -d 'Print the version and exit'
+complete -c kytfeed -l server -x -d 'The IPv4 address of the server'
+complete -c kytfeed -l port -x -d 'Its UDP port'
+complete -c kytfeed -l reliable -x -d 'Milliseconds between retries'
+complete -c kytfeed -l without-profile -d 'Reliable, 500 ms'
+complete -c kytfeed -l session -x -d 'The session ID'
+complete -c kytfeed -l client-type -x -d 'The client type, 0 to 23'
+complete -c kytfeed -l client-version -x -d 'The client version'
+complete -c kytfeed -l self-version -x -d 'The version of the reporting side'
+complete -c kytfeed -l device -x -d 'The device identifier'
+complete -c kytfeed -l interval -x -d 'Milliseconds between events'
