@@ -164,13 +164,13 @@ std::optional<Error> Stage::putStorebag(const std::string& name, const Dictionar
   return writeFile(options_.folder + "/bags/" + name + ".plist", std::get<std::string>(document), 0644);
 }
 
-std::optional<Error> Stage::startDaemon() {
+std::optional<Error> Stage::startDaemon(const std::string& insteadOfIt) {
+  const std::string started = insteadOfIt.empty() ? program("kytreportingd") : insteadOfIt;
   ChildProcess::Options how;
   how.outputFile = daemonLog();
   how.user = options_.daemonUser;
-  daemon_ = ChildProcess::start(program("kytreportingd"),
-                                {"--root", options_.folder, "--log-level", options_.logLevel}, how);
-  if (!daemon_) return failure(program("kytreportingd") + ": " + std::strerror(errno));
+  daemon_ = ChildProcess::start(started, {"--root", options_.folder, "--log-level", options_.logLevel}, how);
+  if (!daemon_) return failure(started + ": " + std::strerror(errno));
   const bool up =
       waitUntil(seconds(30), [this] { return takesConnections(socketPath()) || !daemon_->isRunning(); });
   if (!up || !daemon_->isRunning()) return failure("the daemon did not start: " + daemonLog());

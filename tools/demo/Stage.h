@@ -42,8 +42,8 @@ class Stage {
 
   // Signs the bag and lets the server hand it out under that name.
   [[nodiscard]] std::optional<Error> putStorebag(const std::string& name, const Dictionary& bag);
-  // Starts it and waits until its socket takes connections.
-  [[nodiscard]] std::optional<Error> startDaemon();
+  // Starts it, or another program in its place (which becomes it), and waits until its socket takes connections.
+  [[nodiscard]] std::optional<Error> startDaemon(const std::string& insteadOfIt = {});
   // SIGTERM, then the exit status (none: it did not end within `timeout`).
   [[nodiscard]] std::optional<int> stopDaemon(std::chrono::milliseconds timeout = std::chrono::seconds(15));
   [[nodiscard]] ChildProcess* daemon() { return daemon_ ? &*daemon_ : nullptr; }

@@ -3,14 +3,23 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
 #include <signal.h>
+#include <sys/ioctl.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
+#include <cstddef>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <string>
+#include <thread>
 
 #include "tests/support/ChildProcess.h"
 #include "tests/support/Eventually.h"
@@ -217,6 +226,91 @@ TEST_F(Broker, SurvivesASignalOfItsTerminal) {
   for (const int signal : {SIGINT, SIGTERM, SIGHUP}) ASSERT_EQ(::kill(process, signal), 0);
   folder_.write("b", "1");
   EXPECT_EQ(remove(open("b"), "b"), 0);
+}
+
+// A file system that never answers: whoever removes a name stands still, as long as this object's process does not
+// end it. Only for a process of its own, and for those it starts from here on.
+class SilentFileSystem {
+ public:
+  // Empty, or why this system cannot do that.
+  std::string begin() {
+    sock_filter code[] = {
+        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_unlinkat, 0, 1),
+        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_USER_NOTIF),
+        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+    };
+    sock_fprog program = {std::size(code), code};
+    if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return "no_new_privs: " + errorText(errno);
+    const long listener =
+        ::syscall(SYS_seccomp, SECCOMP_SET_MODE_FILTER, SECCOMP_FILTER_FLAG_NEW_LISTENER, &program);
+    if (listener < 0) return "seccomp: " + errorText(errno);
+    listener_ = FileHandle(static_cast<int>(listener));
+    return {};
+  }
+  // The next process that stands still, and does so until it ends.
+  [[nodiscard]] pid_t next() const {
+    seccomp_notif call = {};
+    return ::ioctl(listener_.get(), SECCOMP_IOCTL_NOTIF_RECV, &call) == 0 ? static_cast<pid_t>(call.pid) : -1;
+  }
+
+ private:
+  FileHandle listener_;
+};
+
+// Runs where removing hangs, and prints what went wrong. Three removals at once: one that hangs, one that hangs in
+// a child that not even the alarm ends, and one that fails before it comes to that.
+std::string removeWhereItHangs(const TemporaryFolder& folder) {
+  using Clock = std::chrono::steady_clock;
+  SilentFileSystem silent;
+  if (const std::string problem = silent.begin(); !problem.empty()) return "cannot: " + problem;
+  const auto broker = startBroker();
+  struct Removal {
+    int result = -1;
+    double seconds = 0;
+  };
+  const auto remove = [&](const char* name, const char* opened, Removal& removal) {
+    const FileHandle file(::open((folder / opened).c_str(), O_RDONLY | O_CLOEXEC));
+    const FileHandle directory(::open(folder.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const auto begin = Clock::now();
+    removal.result = broker->remove(file.get(), directory.get(), name, myself());
+    removal.seconds = std::chrono::duration<double>(Clock::now() - begin).count();
+  };
+  Removal hanging, stopped, other;
+  std::thread first([&] { remove("a", "a", hanging); });
+  const pid_t hangs = silent.next();
+  std::thread second([&] { remove("b", "b", stopped); });
+  const pid_t stops = silent.next();
+  if (hangs <= 0 || stops <= 0) return "nobody hangs";
+  ::kill(stops, SIGSTOP);
+  remove("a", "b", other);
+  first.join();
+  second.join();
+  ::kill(stops, SIGKILL);
+  std::string wrong;
+  const auto expect = [&](bool holds, const std::string& what) {
+    if (!holds) wrong += what + "; ";
+  };
+  expect(other.result == ESTALE && other.seconds < 4,
+         "another was held up: " + std::to_string(other.seconds));
+  expect(hanging.result == EIO, "the hanging one: " + errorText(hanging.result));
+  expect(hanging.seconds > 4.5, "the alarm came after " + std::to_string(hanging.seconds));
+  expect(stopped.result == ETIMEDOUT, "the stopped one: " + errorText(stopped.result));
+  expect(stopped.seconds > 5.5, "patience ended after " + std::to_string(stopped.seconds));
+  expect(eventually([&] { return ::kill(hangs, 0) != 0 && errno == ESRCH; }), "the child is still there");
+  remove("a", "b", other);
+  expect(other.result == ESTALE, "afterwards: " + errorText(other.result));
+  return wrong;
+}
+
+TEST_F(Broker, EndsAChildWhoseFileSystemNeverAnswersAndServesOthersMeanwhile) {
+  folder_.write("a", "1");
+  folder_.write("b", "2");
+  const std::string outcome = inChildProcess([this] { return removeWhereItHangs(folder_); });
+  if (outcome.starts_with("cannot: ")) GTEST_SKIP() << outcome;
+  EXPECT_EQ(outcome, "");
+  EXPECT_TRUE(exists("a"));
+  EXPECT_TRUE(exists("b"));
 }
 
 }  // namespace

@@ -8,9 +8,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <filesystem>
+#include <functional>
 #include <string>
 #include <thread>
 
@@ -177,47 +179,131 @@ TEST_F(FileExtensionTest, FilesOfTheKernelAreEmpty) {
   EXPECT_EQ(contents(*file), "");
 }
 
-TEST_F(FileExtensionTest, AFileThatGrowsIsReadAsLongAsItWas) {
-  constexpr size_t kStart = 100000;
-  const std::string path = folder_.write("log", std::string(kStart, 'x'));
-  const auto file = access(path);
-  std::atomic<bool> stop{false}, grown{false};
-  std::jthread writer([&] {
-    const Descriptor out = ownDescriptor(::open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC));
-    const std::string more(4096, 'x');
-    for (size_t size = kStart; !stop && size < kPlenty - more.size(); size += more.size()) {
-      EXPECT_EQ(::write(out.get(), more.data(), more.size()), static_cast<ssize_t>(more.size()));
-      grown = true;
-    }
-  });
-  EXPECT_TRUE(eventually([&] { return grown.load(); }));
-  const std::string read = contents(*file);
-  stop = true;
-  EXPECT_GT(read.size(), kStart);
-  EXPECT_EQ(read, std::string(read.size(), 'x'));
+// What follows changes the file at exact moments: `BeforeRead` runs in front of each read and says how many bytes
+// that read may return at most, as any read may return fewer than asked for; negative: an error instead.
+class ReadsUnder {
+ public:
+  using BeforeRead = std::function<ssize_t(int number, size_t wanted)>;
+  explicit ReadsUnder(BeforeRead before) { before_ = std::move(before); }
+  ~ReadsUnder() {
+    before_ = nullptr;
+    number_ = 0;
+  }
+  ReadsUnder(const ReadsUnder&) = delete;
+  ReadsUnder& operator=(const ReadsUnder&) = delete;
+
+  static BeforeRead before_;
+  static int number_;  // of reads so far
+};
+ReadsUnder::BeforeRead ReadsUnder::before_;
+int ReadsUnder::number_ = 0;
+
+// Text in which every position can be told from its neighbours.
+std::string pattern(size_t size) {
+  std::string text;
+  for (size_t i = 0; text.size() < size; ++i) text += std::to_string(i) + "\n";
+  text.resize(size);
+  return text;
 }
 
-TEST_F(FileExtensionTest, AFileThatShrinksIsReadAsFarAsItIsThere) {
-  constexpr size_t kStart = 900000;
-  const std::string path = folder_.write("log", std::string(kStart, 'x'));
-  const auto file = access(path);
+class ChangingFile : public FileExtensionTest {
+ protected:
+  static constexpr size_t kStart = 100000;
+  const std::string start_ = pattern(kStart), path_ = folder_.write("log", start_);
+  const std::unique_ptr<FileAccess> file_ = access(path_);
+  void append(size_t size) const {
+    const Descriptor out = ownDescriptor(::open(path_.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC));
+    const std::string more(size, '#');
+    EXPECT_EQ(::write(out.get(), more.data(), size), static_cast<ssize_t>(size));
+  }
+  void cut(size_t size) const { EXPECT_EQ(::truncate(path_.c_str(), static_cast<off_t>(size)), 0); }
+};
+
+TEST_F(ChangingFile, GrownBeforeTheFirstReadIsReadAsLongAsItWas) {
+  const ReadsUnder reads([&](int number, size_t wanted) {
+    if (number == 0) append(5000);
+    return static_cast<ssize_t>(wanted);
+  });
+  EXPECT_EQ(contents(*file_), start_);
+  EXPECT_EQ(std::filesystem::file_size(path_), kStart + 5000);
+}
+
+TEST_F(ChangingFile, GrowingAtEveryReadIsReadAsLongAsItWas) {
+  const ReadsUnder reads([&](int, size_t) {
+    append(7000);
+    return 4096;
+  });
+  EXPECT_EQ(contents(*file_), start_);
+  EXPECT_EQ(ReadsUnder::number_, 25) << "100,000 bytes at 4,096 each, and not one read more";
+}
+
+TEST_F(ChangingFile, GrownOverTheLimitMeanwhileIsReadAsLongAsItWas) {
+  const ReadsUnder reads([&](int number, size_t wanted) {
+    if (number == 0) append(kPlenty);
+    return static_cast<ssize_t>(wanted);
+  });
+  EXPECT_EQ(contents(*file_, kStart), start_);
+}
+
+TEST_F(ChangingFile, CutBeforeTheFirstReadIsReadAsFarAsItIsThere) {
+  const ReadsUnder reads([&](int, size_t wanted) {
+    cut(10);
+    return static_cast<ssize_t>(wanted);
+  });
+  EXPECT_EQ(contents(*file_), start_.substr(0, 10));
+}
+
+TEST_F(ChangingFile, CutToNothingIsEmpty) {
+  const ReadsUnder reads([&](int, size_t wanted) {
+    cut(0);
+    return static_cast<ssize_t>(wanted);
+  });
+  EXPECT_EQ(contents(*file_), "");
+}
+
+TEST_F(ChangingFile, CutBehindWhatWasReadEndsThere) {
+  const ReadsUnder reads([&](int number, size_t) {
+    if (number == 1) cut(1000);
+    return 4096;
+  });
+  EXPECT_EQ(contents(*file_), start_.substr(0, 4096)) << "what had been read, and nothing made up";
+}
+
+TEST_F(ChangingFile, CutInFrontOfTheNextReadEndsWhereItEnds) {
+  const ReadsUnder reads([&](int number, size_t) {
+    if (number == 1) cut(5000);
+    return 4096;
+  });
+  EXPECT_EQ(contents(*file_), start_.substr(0, 5000));
+}
+
+TEST_F(ChangingFile, ReadsOnAfterASignalAndFailsWithAnError) {
+  {
+    const ReadsUnder reads([&](int number, size_t) { return number % 2 == 0 ? -EINTR : 30000; });
+    EXPECT_EQ(contents(*file_), start_);
+  }
+  const ReadsUnder reads([&](int number, size_t) { return number == 1 ? -EIO : 4096; });
+  EXPECT_EQ(contents(*file_), "(failed)");
+}
+
+// And without choosing the moment: whatever a writer does, what is read was in the file.
+TEST_F(ChangingFile, CutAndGrownAllTheTimeGivesNothingThatWasNeverThere) {
   std::atomic<bool> stop{false};
   std::jthread writer([&] {
     while (!stop) {
-      EXPECT_EQ(::truncate(path.c_str(), 10), 0);
-      EXPECT_EQ(::truncate(path.c_str(), kStart), 0);
+      cut(10);
+      append(kStart);
     }
   });
-  bool shrunk = false;
   for (int round = 0; round < 200; ++round) {
-    const std::string read = contents(*file);
-    ASSERT_LE(read.size(), kStart);
-    ASSERT_GE(read.size(), 10u);
-    ASSERT_EQ(read.substr(0, 10), "xxxxxxxxxx");
-    shrunk = shrunk || read.size() < kStart;
+    const std::string read = contents(*file_);
+    ASSERT_LE(read.size(), kStart + 10);
+    ASSERT_EQ(read.substr(0, 10), start_.substr(0, 10));
+    // Of the first contents, of what was appended, or holes of what was just cut off.
+    for (size_t i = 10; i < read.size(); ++i)
+      ASSERT_TRUE(read[i] == '#' || read[i] == '\0' || (i < kStart && read[i] == start_[i])) << i;
   }
   stop = true;
-  EXPECT_TRUE(shrunk);
 }
 
 TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnceAndTheOnlyOneIsAlwaysRead) {
@@ -261,4 +347,20 @@ TEST_F(FileExtensionTest, WithoutABrokerNothingIsRemovedAndItIsCounted) {
 }
 
 }  // namespace
+
+// The linker leads every read of this program's files here first.
+extern "C" {
+ssize_t __real_pread(int file, void* bytes, size_t size, off_t position);
+ssize_t __wrap_pread(int file, void* bytes, size_t size, off_t position);
+ssize_t __wrap_pread(int file, void* bytes, size_t size, off_t position) {
+  if (!ReadsUnder::before_) return __real_pread(file, bytes, size, position);
+  const ssize_t most = ReadsUnder::before_(ReadsUnder::number_++, size);
+  if (most < 0) {
+    errno = static_cast<int>(-most);
+    return -1;
+  }
+  return __real_pread(file, bytes, std::min(size, static_cast<size_t>(most)), position);
+}
+}
+
 }  // namespace kyt
