@@ -16,6 +16,22 @@ struct Arguments {
   int status = 0;
 };
 
+constexpr char kSessionSteps[] =
+    R"(Steps, by "do"; from standard input each runs as soon as its line is there:
+  {"do":"open","sessionInfo":{…},"userInfo":{…}}   first; the keys are SessionID, ClientType, …;
+                                                   "aggregate":true prints each message of the hierarchy
+  {"do":"configure"}                               prints the live back ends
+  {"do":"states","userInfo":{…}}                   new user information; prints the live back ends
+  {"do":"send","category":1,"type":2,"payload":{…},"flag":0,"repeat":1,"reply":false}
+  {"do":"flush"}                                   posts what is batched
+  {"do":"displayURL"}                              prints the address for people
+  {"do":"sharedData","entries":{…}}                null removes a key
+  {"do":"digestKey","hex":"00ff…","algorithm":0}   signs the posts of the back end qrs
+  {"do":"wait","messages":1}                       until so many aggregated messages have been printed
+  {"do":"finish"}                                  sends what is queued and prints the figures
+
+The manual page kytctl tells more.)";
+
 void addConnectionOptions(CLI::App& command, Arguments& arguments) {
   command.add_option("--socket", arguments.connection.socket,
                      "The daemon's socket, instead of the fixed one");
@@ -41,22 +57,7 @@ void addSend(CLI::App& app, Arguments& a) {
       app.add_subcommand("session", "Run a scripted session: one JSON object a line (kytctl session --help)");
   addConnectionOptions(*session, a);
   session->add_option("script", a.script, "A file, or - for standard input")->required();
-  session->footer(
-      "Steps, by \"do\"; from standard input each runs as soon as its line is there:\n"
-      "  {\"do\":\"open\",\"sessionInfo\":{…},\"userInfo\":{…}}      first; the keys are SessionID, "
-      "ClientType, …;\n"
-      "                                                          \"aggregate\":true prints each message "
-      "of the hierarchy\n"
-      "  {\"do\":\"wait\",\"messages\":1}                            until so many of those have been "
-      "printed\n"
-      "  {\"do\":\"configure\"}                                    prints the live back ends\n"
-      "  {\"do\":\"states\",\"userInfo\":{…}}                        new user information; prints the live "
-      "back ends\n"
-      "  "
-      "{\"do\":\"send\",\"category\":1,\"type\":2,\"payload\":{…},\"flag\":0,\"repeat\":1,\"reply\":false}\n"
-      "  {\"do\":\"flush\"}  {\"do\":\"displayURL\"}  {\"do\":\"finish\"}\n"
-      "  {\"do\":\"sharedData\",\"entries\":{…}}                     null removes a key\n"
-      "  {\"do\":\"digestKey\",\"hex\":\"00ff…\",\"algorithm\":0}");
+  session->footer(kSessionSteps);
   session->callback([&a] { a.status = sessionCommand(a.connection, a.script); });
 }
 
