@@ -35,6 +35,8 @@ constexpr const char* kCallsOfSanitizers[] = {
     "ptrace",
     "prctl(PR_SET_PTRACER)",
     "prctl(PR_GET_DUMPABLE)",
+    "open(*, no O_TRUNC)",
+    "getdents",
     "clone(has CLONE_VM|CLONE_FS|CLONE_FILES|CLONE_UNTRACED)",
 };
 
