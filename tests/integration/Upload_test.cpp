@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <future>
 #include <string>
@@ -176,14 +177,18 @@ TEST_F(Uploads, ThatNobodyAnswersEndWithTheDaemonAndLoseNoEvent) {
 }
 
 // Two hundred sessions wait in uploads on a server that does not answer. The bound asserted: the median of
-// another session's round trips may grow by two milliseconds over what it was before they waited.
+// another session's round trips may grow by two milliseconds over what it was before they waited. What they took is
+// printed and recorded.
 TEST_F(Uploads, SessionsThatWaitForTheirServerHoldUpNoOther) {
-  constexpr int kWaiting = 200, kRounds = 200;
+  constexpr int kWaiting = 200, kRounds = 1000;
   const Milliseconds allowance(2);
   prepare();
   TestClient other(socket(), kDulvek, "reporting");
   ASSERT_EQ(other.configure(), "live: httppost");
-  const auto median = [&] {
+  struct RoundTrips {
+    Milliseconds median, percentile99;
+  };
+  const auto roundTrips = [&](const char* name) {
     std::vector<Milliseconds> times;
     for (int i = 0; i < kRounds; ++i) {
       const auto begin = Clock::now();
@@ -191,8 +196,13 @@ TEST_F(Uploads, SessionsThatWaitForTheirServerHoldUpNoOther) {
       EXPECT_EQ(other.displayURL(), "https://display.example.org/");
       times.emplace_back(Clock::now() - begin);
     }
-    std::nth_element(times.begin(), times.begin() + kRounds / 2, times.end());
-    return times[kRounds / 2];
+    std::sort(times.begin(), times.end());
+    const RoundTrips found{times[kRounds / 2], times[kRounds * 99 / 100]};
+    std::printf("%s: median %.3f ms, 99th percentile %.3f ms\n", name, found.median.count(),
+                found.percentile99.count());
+    RecordProperty(std::string(name) + "Median", std::to_string(found.median.count()));
+    RecordProperty(std::string(name) + "Percentile99", std::to_string(found.percentile99.count()));
+    return found;
   };
 
   ASSERT_TRUE(stage_->control("/control/reply", R"({"path":"/upload","hang":true,"times":0})"));
@@ -201,17 +211,15 @@ TEST_F(Uploads, SessionsThatWaitForTheirServerHoldUpNoOther) {
     clients.push_back(std::make_unique<TestClient>(socket(), kCadmor, "uploading", 1000 + i));
     ASSERT_EQ(clients.back()->configure(), "live: httppost uploadserver") << i << daemonLog();
   }
-  const Milliseconds before = median();
+  const RoundTrips before = roundTrips("MillisecondsBefore");
   std::vector<std::future<std::string>> answers;
   for (int i = 0; i < kWaiting; ++i) {
     const std::string file = files_.write("f" + std::to_string(i), "contents");
     answers.push_back(startUpload(*clients[static_cast<size_t>(i)], file)->get_future());
   }
   ASSERT_TRUE(eventually([&] { return total("posts") == kWaiting; })) << total("posts") << daemonLog();
-  const Milliseconds during = median();
-  EXPECT_LT(during.count(), before.count() + allowance.count());
-  RecordProperty("MedianBeforeMilliseconds", std::to_string(before.count()));
-  RecordProperty("MedianDuringMilliseconds", std::to_string(during.count()));
+  const RoundTrips during = roundTrips("MillisecondsDuring");
+  EXPECT_LT(during.median.count(), before.median.count() + allowance.count());
   EXPECT_EQ(other.flush(), "flushed");
   for (auto& answer : answers)
     EXPECT_EQ(answer.wait_for(std::chrono::seconds(0)), std::future_status::timeout) << "it does not wait";
