@@ -64,6 +64,9 @@ class DaemonProcess {
   [[nodiscard]] std::string log() const { return root_.read("log"); }
   [[nodiscard]] bool logged(std::string_view text) const { return log().find(text) != std::string::npos; }
   void writeSettings(const std::string& text) { root_.write("etc/kytreportingd/kytreportingd.toml", text); }
+  void addSettings(const std::string& text) {
+    writeSettings(root_.read("etc/kytreportingd/kytreportingd.toml") + text);
+  }
   void setRoot(std::string root) { rootOption_ = std::move(root); }
   // Runs in the new process, before the daemon does: for its environment, its user.
   void setBeforeExecution(std::function<void()> work) { beforeExecution_ = std::move(work); }

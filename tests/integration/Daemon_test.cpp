@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <memory>
 #include <string>
@@ -12,10 +13,14 @@
 
 #include "kytreporting/KYTReporting.h"
 #include "tests/integration/DaemonProcess.h"
+#include "tests/support/PlainClient.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
 namespace {
+
+constexpr size_t kManySessions = kSanitized ? 1000 : 5000;
 
 class Daemon : public ::testing::Test {
  protected:
@@ -184,6 +189,51 @@ TEST_F(Daemon, PostsWhatSessionsHoldOnSIGTERM) {
   EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   EXPECT_EQ(posts(), 2U) << "the batch of each session, start and stop messages included";
   EXPECT_TRUE(daemon_.logged("shutDown: 3 requests started, 3 completed, 0 failed")) << daemon_.log();
+}
+
+// Each session's stop message tells what all sessions hold, so the end of all of them together is the most that the
+// daemon ever has to do at once.
+TEST_F(Daemon, EndsThousandsOfSessionsWithinTheGrace) {
+  const rlim_t needed = kManySessions + 1000;
+  rlimit limit = {};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
+  if (limit.rlim_max < needed) GTEST_SKIP() << "needs " << needed << " descriptors";
+  const rlimit raised = {std::max(limit.rlim_cur, needed), limit.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &raised), 0);
+  // A back end that posts nothing at the end: what is measured is the daemon's own work.
+  const Dictionary profile{{"post_url", server_.url("/upload")}};
+  const Dictionary bag{{"version", "1"}, {"vantu_internal", Dictionary{{"uploadserver", profile}}}};
+  TestHTTPServer::Reply reply;
+  reply.body = signedBag(bag, propertyLists_);
+  server_.setReply(reply);
+  daemon_.addSettings("[limits]\nmax_connections_per_user = 16384\n");
+  daemon_.start({});
+  ASSERT_TRUE(eventually([this] { return daemon_.logged("start loop."); })) << daemon_.log();
+  std::vector<std::unique_ptr<test::PlainClient>> clients;
+  const Dictionary info{{kKYTReportingSessionInfoSessionID, 7}, {kKYTReportingSessionInfoClientType, 20}};
+  for (size_t i = 0; i < kManySessions; ++i) {
+    clients.push_back(std::make_unique<test::PlainClient>(daemon_.socketPath()));
+    ASSERT_TRUE(clients.back()->connected() && clients.back()->shakeHands()) << i << daemon_.log();
+    clients.back()->call(
+        "SetSessionInfo", "a{sv}aa{sv}avb",
+        [&](MessageWriter& out) {
+          out.writeDictionary(info);
+          out.writeOptionalDictionary(std::nullopt);
+          out.writeArray({});
+          out.writeBoolean(false);
+        },
+        false);
+    clients.back()->call("StartConfigWithCompletionHandler");
+  }
+  for (const auto& client : clients) ASSERT_TRUE(client->receive()) << daemon_.log();
+  const auto begin = std::chrono::steady_clock::now();
+  daemon_.terminate();
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  const std::chrono::duration<double> took = std::chrono::steady_clock::now() - begin;
+  EXPECT_FALSE(daemon_.logged("shutDown: Sessions have not ended in time")) << took.count() << " s";
+  std::printf("%zu sessions ended in %.2f s\n", kManySessions, took.count());
+  RecordProperty("Seconds", std::to_string(took.count()));
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
 }
 
 TEST_F(Daemon, ASlowServerIsWaitedForUntilTheDeadline) {
