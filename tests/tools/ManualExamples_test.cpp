@@ -100,23 +100,50 @@ TEST_F(ManualExamplesOnAStage, OfTheDaemonRuns) {
   EXPECT_NE(run.text.find("start loop"), std::string::npos) << run.text;
 }
 
+// The guide for those who ship a fleet, as typed.
+TEST_F(ManualExamplesOnAStage, OfTheFleetsGuideRun) {
+  ASSERT_FALSE(tools::writeFile(stage_->folder() + "/dulvek.toml", blockOf("FLEET.md", "toml"), 0644));
+  std::string commands = "kytctl keys make keys/\n";
+  for (const std::string& line : linesOf(textOf("docs/FLEET.md")))
+    if (line.starts_with("    ")) commands += line + "\n";
+  const ProgramRun run = shell(commands);
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find("\"sampling_threshold\": 0.1"), std::string::npos) << run.text;
+  EXPECT_EQ(run.text.find("warning"), std::string::npos) << run.text;
+}
+
 // The compiler, the flags and the library of this build.
-TEST_F(ManualExamplesOnAStage, OfTheLibraryCompileAndReport) {
-  const std::pair<const char*, const char*> languages[] = {{"c", "c"}, {"cpp", "c++"}};
-  for (const auto& [name, language] : languages) {
-    const std::string source = stage_->folder() + "/example." + name, program = stage_->folder() + "/" + name;
-    ASSERT_FALSE(tools::writeFile(source, exampleOf("libkytreporting.3", name), 0644));
-    const std::string standard = std::string(language) == "c" ? "-std=c11" : "-std=c++20";
-    const ProgramRun compiled =
-        shell(std::string(KYT_CXX " " KYT_USER_FLAGS " -Wall -Wextra -Werror ") + standard + " -x " +
-              language + " -I" KYT_SOURCE_DIR "/client/include -I" KYT_SOURCE_DIR " " + source +
-              " -x none -L" KYT_LIBRARIES " -lkytreporting -Wl,-rpath," KYT_LIBRARIES " -o " + program);
-    ASSERT_EQ(compiled.status, 0) << compiled.text;
-    const ProgramRun run = shell(program);
+class ManualProgramsOnAStage : public ManualExamplesOnAStage {
+ protected:
+  [[nodiscard]] std::string compile(const std::string& name, const std::string& language,
+                                    const std::string& text) const {
+    const std::string program = stage_->folder() + "/" + name, source = program + ".source";
+    if (auto error = tools::writeFile(source, text, 0644)) return error->localizedDescription;
+    return shell(std::string(KYT_CXX " " KYT_USER_FLAGS " -Wall -Wextra -Werror -x ") + language +
+                 (language == "c" ? " -std=c11" : " -std=c++20") +
+                 " -I" KYT_SOURCE_DIR "/client/include -I" KYT_SOURCE_DIR " " + source +
+                 " -x none -L" KYT_LIBRARIES " -lkytreporting -Wl,-rpath," KYT_LIBRARIES " -o " + program)
+        .text;
+  }
+};
+
+TEST_F(ManualProgramsOnAStage, OfTheLibraryCompileAndReport) {
+  for (const auto& [name, language] : {std::pair("c", "c"), std::pair("cpp", "c++")}) {
+    ASSERT_EQ(compile(name, language, exampleOf("libkytreporting.3", name)), "");
+    const ProgramRun run = shell(stage_->folder() + "/" + name);
     EXPECT_EQ(run.status, 0) << run.text;
     EXPECT_EQ(run.text, std::string(name) == "c" ? "live: httppost\n" : "");
   }
   EXPECT_TRUE(arrive("client=example&method=10&status=1", 2)) << daemonLog();
+}
+
+TEST_F(ManualProgramsOnAStage, OfTheProgrammersGuideCompileAndReport) {
+  ASSERT_EQ(compile("guide", "c++",
+                    "#include <kytreporting/KYTReporting.h>\nint main() {\n" + blockOf("PROGRAMS.md", "cpp") +
+                        "}\n"),
+            "");
+  EXPECT_EQ(shell("./guide").status, 0);
+  EXPECT_TRUE(arrive("client=example&service=demo&method=10", 1)) << daemonLog();
 }
 
 }  // namespace

@@ -93,6 +93,15 @@ inline Help helpOf(const std::string& program, std::vector<std::string> command 
   return help;
 }
 
+// The first fenced block of that language in a document.
+inline std::string blockOf(const std::string& document, const std::string& language) {
+  const std::string text = textOf("docs/" + document), fence = "\n```" + language + "\n";
+  const size_t start = text.find(fence);
+  if (start == std::string::npos) return "no block " + language + " in " + document + "\n";
+  const size_t begin = start + fence.size();
+  return text.substr(begin, text.find("\n```", begin) + 1 - begin);
+}
+
 // The display behind `.\" example: NAME`, as a reader of the page copies it.
 inline std::string exampleOf(const std::string& page, const std::string& name) {
   std::string example;
