@@ -35,6 +35,9 @@ struct Limits {
   // Of one user's files, read and not yet answered: each of a user's many sessions may upload at the same time.
   // One file is always taken.
   static constexpr uint64_t maxUploadingBytesPerUser = 256u << 20;
+  // Requests on their way at once, all sessions; further ones wait in line. Each has a connection of some 45 KiB and a
+  // descriptor, and clients that come and go start them faster than servers answer.
+  static constexpr size_t maxActiveRequests = 1024;
   static constexpr size_t maxWorkers = 512;           // threads
   static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
   static constexpr double handshakeSeconds = 30;

@@ -254,7 +254,9 @@ void SerialQueue::grant() {
   Node* node = head_;
   while (!node->isWaiter) node = node->next;
   std::atomic<int>& granted = static_cast<Waiter*>(node)->granted;
-  granted.store(1, std::memory_order_release);
+  // In one order with notify_one()'s look at whether anybody sleeps: a release alone may become visible after that
+  // look, when the waiter has just gone to sleep, and nobody would wake it.
+  granted.store(1, std::memory_order_seq_cst);
   granted.notify_one();  // uses the address alone: the waiter may be gone
 }
 

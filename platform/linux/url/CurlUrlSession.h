@@ -22,6 +22,7 @@
 #include <vector>
 
 #include "platform/Clock.h"
+#include "platform/Limits.h"
 #include "platform/UrlSession.h"
 
 namespace kyt {
@@ -37,6 +38,7 @@ struct CurlURLSessionOptions {
   Duration noProgressTimeout = std::chrono::seconds(60);
   Duration idleConnectionTime = std::chrono::seconds(30);  // then a session's connections close
   size_t maxIdlePools = 512;                               // sessions with idle connections: descriptors
+  size_t maxActiveRequests = Limits::maxActiveRequests;
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events
   std::string sysClassNet = "/sys/class/net";
   std::string resolverFile = "/etc/resolv.conf";

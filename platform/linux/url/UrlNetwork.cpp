@@ -160,6 +160,7 @@ void URLNetwork::run() {
     takeCommands();
     deadlines_.fireUntil(now_);
     cancelWhatIsUnwanted();
+    activateNextInLine();
     if (cancelled_.load()) {
       MutexLock lock(mutex_);
       if (stopping_ && commands_.empty()) break;
@@ -260,6 +261,12 @@ void URLNetwork::refuse(URLTransfer& transfer) {
 }
 
 void URLNetwork::activate(URLTransfer& transfer) {
+  // One with an end of its own (a storebag's) has no time to wait, and there are few of them.
+  if (active_ >= options_.maxActiveRequests && !transfer.request.timeout) {
+    transfer.phase = URLTransfer::Phase::inLine;
+    line_.push_back(transfer.self);
+    return;
+  }
   std::unique_ptr<URLConnectionPool>& pool =
       transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1];
   if (!pool)
@@ -273,7 +280,16 @@ void URLNetwork::activate(URLTransfer& transfer) {
     return;
   }
   transfer.phase = URLTransfer::Phase::active;
+  ++active_;
   armDeadline(transfer);
+}
+
+void URLNetwork::activateNextInLine() {
+  while (active_ < options_.maxActiveRequests && !line_.empty()) {
+    const std::shared_ptr<URLTransfer> next = std::move(line_.front());
+    line_.pop_front();
+    if (next->phase == URLTransfer::Phase::inLine) activate(*next);
+  }
 }
 
 void URLNetwork::armDeadline(URLTransfer& transfer) {
@@ -319,6 +335,7 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
 }
 
 void URLNetwork::withdraw(URLTransfer& transfer) {
+  if (transfer.phase == URLTransfer::Phase::active) --active_;
   if (transfer.handle != nullptr)
     transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1]->remove(transfer);
   if (transfer.phase == URLTransfer::Phase::waiting) stopWaiting(transfer);

@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <deque>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -104,7 +105,8 @@ class URLNetwork {
   void begin(std::shared_ptr<URLTransfer> transfer);
   [[nodiscard]] bool loadCurl();
   void refuse(URLTransfer& transfer);
-  void activate(URLTransfer& transfer);
+  void activate(URLTransfer& transfer);  // or puts it in line
+  void activateNextInLine();
   void armDeadline(URLTransfer& transfer);
   void withdraw(URLTransfer& transfer);  // from its pool, or from those that wait
   void finish(URLTransfer& transfer);    // its result is set
@@ -155,7 +157,10 @@ class URLNetwork {
   std::string curlProblem_;  // the last one that was logged
   WatchedSockets sockets_;
   std::vector<Command> taken_;
-  bool awaitedGone_ = false;              // those there were when they were cancelled; later ones are refused
+  bool awaitedGone_ = false;  // those there were when they were cancelled; later ones are refused
+  size_t active_ = 0;
+  std::deque<std::shared_ptr<URLTransfer>>
+      line_;                              // those among them that are in line no more are passed over
   LinkedList<URLSessionState> sessions_;  // that have requests or connections
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
   Deadline slowRetry_;

@@ -32,7 +32,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   void deliver();
 
   // The rest is for the network thread.
-  enum class Phase : uint8_t { submitted, active, waiting, done };
+  enum class Phase : uint8_t { submitted, inLine, active, waiting, done };
 
   // Sets what differs between requests; everything else was set when the handle was made.
   void configure(CURL* handle);

@@ -270,6 +270,51 @@ TEST_F(CurlURLSession, SendsARequestWithoutACompletion) {
   EXPECT_EQ(factory().figures().completed, 1u);
 }
 
+TEST_F(CurlURLSession, RequestsOverTheMostAtOnceWaitInLine) {
+  options_.maxActiveRequests = 2;
+  server_.setReply(reply(Behaviour::hold));
+  std::vector<std::unique_ptr<URLSession>> sessions(6);
+  std::vector<std::shared_ptr<URLTask>> tasks;
+  std::vector<Outcome> outcomes(6);
+  for (size_t i = 0; i < 5; ++i) {
+    sessions[i] = session();
+    tasks.push_back(sessions[i]->start(get(server_.url("/" + std::to_string(i))), outcomes[i].completion()));
+  }
+  ASSERT_TRUE(server_.waitForRequests(2));
+  tasks[2]->cancel();
+  ASSERT_TRUE(outcomes[2].wait());
+  EXPECT_EQ(outcomes[2].errorCode(), kURLErrorCancelled);
+  // One that must end in time does not wait.
+  sessions[5] = session();
+  URLRequest urgent = get(server_.url("/urgent"));
+  urgent.timeout = 60s;
+  sessions[5]->start(std::move(urgent), outcomes[5].completion());
+  ASSERT_TRUE(server_.waitForRequests(3));
+  EXPECT_EQ(server_.requests()[2].target, "/urgent");
+  EXPECT_EQ(factory().outstanding(), 5u);
+  server_.release();
+  for (const size_t i : {0, 1, 3, 4, 5}) {
+    ASSERT_TRUE(outcomes[i].wait()) << i;
+    EXPECT_EQ(outcomes[i].status(), 200) << i;
+  }
+  EXPECT_EQ(server_.requestCount(), 5u);
+}
+
+TEST_F(CurlURLSession, WhatWaitsInLineEndsWithTheShutDown) {
+  options_.maxActiveRequests = 1;
+  server_.setReply(reply(Behaviour::hold));
+  auto one = session(), two = session();
+  Outcome a, b;
+  one->start(get(server_.url("/")), a.completion());
+  ASSERT_TRUE(server_.waitForRequests(1));
+  two->start(get(server_.url("/")), b.completion());
+  two.reset();
+  factory().cancelAll();
+  ASSERT_TRUE(a.wait() && b.wait());
+  EXPECT_EQ(b.errorCode(), kURLErrorCancelled);
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+}
+
 TEST_F(CurlURLSession, CompletesARequestInFlightAfterItsSessionIsReleased) {
   server_.setReply(reply(Behaviour::hold, "late"));
   auto urls = session();
