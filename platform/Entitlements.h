@@ -33,6 +33,8 @@ class Entitlements {
   virtual ~Entitlements() = default;
   // The value that a matching grant holds under the key; null when none does. Any matching grant suffices.
   [[nodiscard]] virtual Value valueFor(const PeerCredentials& peer, std::string_view key) = 0;
+  // The path of the program that the peer runs, for a line in the log; empty where that is not known.
+  [[nodiscard]] virtual std::string executableOf(const PeerCredentials& /*peer*/) { return {}; }
 };
 
 }  // namespace kyt

@@ -128,6 +128,7 @@ class DBusConnection final : public Connection,
   size_t needed_ = 0;  // how much kept_ must hold before it is worth looking at
   std::vector<Descriptor> descriptors_;
   bool descriptorsAgreed_ = false;
+  bool refused_ = false;  // what was asked for was not granted
   bool resumed_ = false, started_ = false, ended_ = false;
 
   // Guarded: the reactor's thread, the queue and writers arm the watch.

@@ -34,6 +34,11 @@ struct SignOptions {
   std::string output;  // "-": standard output
 };
 
+struct CheckOptions {
+  int32_t pid = 0;   // of a client, or
+  std::string user;  // a name or a number: any client of that user
+};
+
 [[nodiscard]] int sendCommand(const ConnectionOptions& connection, const SendOptions& options);
 [[nodiscard]] int sessionCommand(const ConnectionOptions& connection, const std::string& script);
 
@@ -45,6 +50,9 @@ struct SignOptions {
                                        const std::optional<std::string>& value);
 // `change`: "show", "grant" or "withdraw".
 [[nodiscard]] int consentCommand(const std::string& root, const std::string& change);
+
+// Tells why a client is served (0) or refused (1); 2: that cannot be told.
+[[nodiscard]] int entitlementsCheckCommand(const std::string& root, const CheckOptions& options);
 
 [[nodiscard]] int makeKeysCommand(const std::string& folder, unsigned bits);
 [[nodiscard]] int signCommand(const SignOptions& options);

@@ -11,6 +11,7 @@ struct Arguments {
   ConnectionOptions connection;
   SendOptions send;
   SignOptions sign;
+  CheckOptions check;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
   int status = 0;
@@ -94,6 +95,16 @@ void addDefaults(CLI::App& app, Arguments& a) {
     });
 }
 
+void addEntitlements(CLI::App& app, Arguments& a) {
+  CLI::App* entitlements = app.add_subcommand("entitlements", "Who may connect");
+  entitlements->require_subcommand(1);
+  CLI::App* check = entitlements->add_subcommand("check", "Tell why a client is served or refused");
+  CLI::Option* pid = check->add_option("--pid", a.check.pid, "A process")
+                         ->check(CLI::Range(1, std::numeric_limits<int32_t>::max()));
+  check->add_option("--user", a.check.user, "Any process of a user, by name or number")->excludes(pid);
+  check->callback([&a] { a.status = entitlementsCheckCommand(a.connection.root, a.check); });
+}
+
 void addStorebag(CLI::App& app, Arguments& a) {
   CLI::App* keys = app.add_subcommand("keys", "Keys for signing storebags");
   keys->require_subcommand(1);
@@ -132,6 +143,7 @@ int main(int argc, char** argv) {
   app.fallthrough();
   addSend(app, arguments);
   addDefaults(app, arguments);
+  addEntitlements(app, arguments);
   addStorebag(app, arguments);
   if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
   return arguments.status;

@@ -7,7 +7,7 @@ function __kytctl_words
         if test $value = 1
             set value 0
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
-                --payload --user-info --type --bits --key -o --output --public-key
+                --payload --user-info --type --pid --user --bits --key -o --output --public-key
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -65,10 +65,12 @@ complete -c kytctl -n __kytctl_at -a send -d 'Send one event'
 complete -c kytctl -n __kytctl_at -a session -d 'Run a scripted session'
 complete -c kytctl -n __kytctl_at -a defaults -d 'Read and change user defaults'
 complete -c kytctl -n __kytctl_at -a consent -d 'The consent of the owner'
+complete -c kytctl -n __kytctl_at -a entitlements -d 'Who may connect'
 complete -c kytctl -n __kytctl_at -a keys -d 'Keys for signing storebags'
 complete -c kytctl -n __kytctl_at -a storebag -d 'Signed configurations'
 complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'
 complete -c kytctl -n '__kytctl_at consent' -a 'show grant withdraw'
+complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show'
 
@@ -88,6 +90,8 @@ complete -c kytctl -n '__kytctl_at session' -F
 complete -c kytctl -n '__kytctl_at -b defaults write' -l type -x -a 'string integer real boolean' -d 'What the value is'
 complete -c kytctl -n '__kytctl_due 1 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_domains)'
 complete -c kytctl -n '__kytctl_due 2 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_keys)'
+complete -c kytctl -n '__kytctl_at -b entitlements check' -l pid -x -a '(__fish_complete_pids)' -d 'A process'
+complete -c kytctl -n '__kytctl_at -b entitlements check' -l user -x -a '(__fish_complete_users)' -d 'Any process of a user'
 complete -c kytctl -n '__kytctl_at -b keys make' -l bits -x -d 'Length of the key, 2048 to 16384'
 complete -c kytctl -n '__kytctl_at keys make' -a '(__fish_complete_directories)'
 complete -c kytctl -n '__kytctl_at -b storebag sign' -l key -r -F -d 'The private key'

@@ -23,6 +23,7 @@ struct Answer {
   int32_t error = 0;
   int32_t pid = 0;  // of the question, so that an answer that came too late is not taken for another's
   ProgramIdentity program;
+  char path[256] = "";
 };
 
 // Nothing here allocates or takes a lock: it runs in a forked process.
@@ -36,8 +37,12 @@ Answer inspect(int32_t pid) {
     answer.error = ESRCH;
   } else if (::stat(path, &status) != 0) {
     answer.error = errno;
+    // Without its folder it is not there for us: it has ended, or it is hidden (a mount of /proc with hidepid).
+    std::snprintf(path, sizeof path, "/proc/%d", pid);
+    if (answer.error == ENOENT && ::stat(path, &status) != 0) answer.error = ESRCH;
   } else {
     answer.program = {status.st_dev, status.st_ino};
+    (void)!::readlink(path, answer.path, sizeof answer.path - 1);
   }
   return answer;
 }
@@ -74,6 +79,21 @@ CapabilitySet neededCapabilities() {
   }
 }
 
+// In the daemon.
+Answer ask(int socket, int32_t pid) {
+  Answer failed;
+  failed.error = EIO;
+  if (::send(socket, &pid, sizeof pid, MSG_NOSIGNAL) != sizeof pid) return failed;
+  while (true) {
+    Answer answer;
+    const ssize_t count = ::recv(socket, &answer, sizeof answer, 0);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0 && errno == EAGAIN) failed.error = ETIMEDOUT;
+    if (count != sizeof answer) return failed;
+    if (answer.pid == pid) return answer;
+  }
+}
+
 std::variant<ProgramIdentity, int> resultOf(const Answer& answer) {
   if (answer.error != 0) return answer.error;
   return answer.program;
@@ -83,6 +103,10 @@ std::variant<ProgramIdentity, int> resultOf(const Answer& answer) {
 
 std::variant<ProgramIdentity, int> DirectProgramInspector::runningProgram(int32_t pid) {
   return resultOf(inspect(pid));
+}
+
+std::string DirectProgramInspector::programPath(int32_t pid) {
+  return inspect(pid).path;
 }
 
 std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspectorProcess::start() {
@@ -111,14 +135,12 @@ ProgramInspectorProcess::~ProgramInspectorProcess() {
 
 std::variant<ProgramIdentity, int> ProgramInspectorProcess::runningProgram(int32_t pid) {
   MutexLock lock(mutex_);
-  if (::send(socket_.get(), &pid, sizeof pid, MSG_NOSIGNAL) != sizeof pid) return EIO;
-  while (true) {
-    Answer answer;
-    const ssize_t count = ::recv(socket_.get(), &answer, sizeof answer, 0);
-    if (count < 0 && errno == EINTR) continue;
-    if (count != sizeof answer) return count < 0 && errno == EAGAIN ? ETIMEDOUT : EIO;
-    if (answer.pid == pid) return resultOf(answer);
-  }
+  return resultOf(ask(socket_.get(), pid));
+}
+
+std::string ProgramInspectorProcess::programPath(int32_t pid) {
+  MutexLock lock(mutex_);
+  return ask(socket_.get(), pid).path;
 }
 
 }  // namespace kyt

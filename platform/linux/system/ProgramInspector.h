@@ -2,8 +2,8 @@
 //
 // A confined process cannot ask: Landlock keeps it from looking at processes outside its own confinement,
 // whatever its privileges. So a small process is forked before the confinement is entered and asks on the
-// daemon's behalf. It knows one question, takes a process number and answers two numbers; it ends when the
-// daemon does.
+// daemon's behalf. It knows one question, takes a process number and answers two numbers and a path; it ends when
+// the daemon does.
 #pragma once
 
 #include <cstdint>
@@ -25,15 +25,19 @@ struct ProgramIdentity {
 class ProgramInspector {
  public:
   virtual ~ProgramInspector() = default;
-  // The program of the process that has this number now, or errno (EACCES: not allowed to know). The caller
-  // makes sure afterwards that the process it means was still alive.
+  // The program of the process that has this number now, or errno: EACCES: not allowed to know; ENOENT: it is ending
+  // and runs nothing any more; ESRCH: there is no such process, or none that may be seen. The caller makes sure
+  // afterwards that the process it means was still alive.
   [[nodiscard]] virtual std::variant<ProgramIdentity, int> runningProgram(int32_t pid) = 0;
+  // Where that program was found when it was started, cut to some 250 bytes; empty when that may not be known.
+  [[nodiscard]] virtual std::string programPath(int32_t pid) = 0;
 };
 
 // Asks itself: for processes that are not confined.
 class DirectProgramInspector final : public ProgramInspector {
  public:
   [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override;
+  [[nodiscard]] std::string programPath(int32_t pid) override;
 };
 
 class ProgramInspectorProcess final : public ProgramInspector {
@@ -43,6 +47,7 @@ class ProgramInspectorProcess final : public ProgramInspector {
   ~ProgramInspectorProcess() override;  // ends the process and waits for it
   // Waits for the answer, two seconds at most.
   [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(mutex_);
+  [[nodiscard]] std::string programPath(int32_t pid) override EXCLUDES(mutex_);
 
  private:
   ProgramInspectorProcess(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}

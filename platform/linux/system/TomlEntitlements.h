@@ -1,13 +1,5 @@
-// Who may connect, as entitlements.d/*.toml grants it:
-//
-//   [[grant]]
-//   user = "videocall"        # a name or a number; and/or group, executable (a path), security_label: all
-//   must match "com.vantu.private.kytreportingd" = true
-//
-// Any matching grant suffices. Only files that nobody but root can write count (`trustedUser` besides, for a
-// private root). What is wrong makes a grant or a file count for nothing, never for more: a key without a
-// point that is no criterion is taken for a misspelt one. Each problem is logged once for each state of the
-// file.
+// Who may connect, as entitlements.d/*.toml grants it (EntitlementsFile.h). Any matching grant suffices. Each problem of a
+// file is logged once for each state of the file.
 //
 // The files are looked at (a stat each) for every connection and read again when they changed.
 #pragma once
@@ -24,27 +16,12 @@
 #include "platform/Entitlements.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
+#include "platform/linux/system/EntitlementsFile.h"
 #include "platform/linux/system/Files.h"
 #include "platform/linux/system/ProgramInspector.h"
 #include "platform/linux/system/Toml.h"
 
 namespace kyt {
-
-struct EntitlementGrant {
-  // A name, or a number when the file says one.
-  std::optional<std::variant<std::string, int64_t>> user, group;
-  std::optional<std::string> executable, securityLabel;
-  std::map<std::string, Value, std::less<>> values;
-};
-
-struct EntitlementGrants {
-  std::vector<EntitlementGrant> grants;
-  std::vector<TomlError> problems;  // of grants that were left out
-};
-
-// The grants of one file's text; an error when it cannot be read as a whole.
-[[nodiscard]] std::variant<EntitlementGrants, TomlError> parseEntitlements(std::string_view text,
-                                                                           std::string_view name);
 
 struct TomlEntitlementsOptions {
   std::string folder;
@@ -56,6 +33,7 @@ class TomlEntitlements final : public Entitlements {
   TomlEntitlements(TomlEntitlementsOptions options, ProgramInspector& inspector, Log& log,
                    Counters& counters);
   [[nodiscard]] Value valueFor(const PeerCredentials& peer, std::string_view key) override EXCLUDES(mutex_);
+  [[nodiscard]] std::string executableOf(const PeerCredentials& peer) override;
 
  private:
   struct File {
@@ -67,9 +45,7 @@ class TomlEntitlements final : public Entitlements {
   void readFile(const std::string& name) REQUIRES(mutex_);
   void report(const std::string& path, const FileIdentity& identity, const TomlError& problem)
       REQUIRES(mutex_);
-  [[nodiscard]] bool matches(const EntitlementGrant& grant, const PeerCredentials& peer) REQUIRES(mutex_);
-  [[nodiscard]] bool runs(const PeerCredentials& peer, const std::string& executable) REQUIRES(mutex_);
-  void sayOnce(const char* why) REQUIRES(mutex_);
+  void sayOnce(const std::string& why) REQUIRES(mutex_);
 
   const TomlEntitlementsOptions options_;
   ProgramInspector& inspector_;

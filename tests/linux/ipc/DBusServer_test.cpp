@@ -190,6 +190,22 @@ TEST(DBusServer, RefusesAClientWithoutTheEntitlementBeforeTellingItAnything) {
   EXPECT_EQ(server.counted(Reason::unentitledConnection), 1u);
 }
 
+TEST(DBusServer, DescribesARefusedConnectionWithTheCommandThatTellsWhy) {
+  Server server;
+  {
+    PlainClient client(server.path);
+    ASSERT_TRUE(client.shakeHands());
+  }
+  server.entitlements.entitled = false;
+  PlainClient client(server.path);
+  EXPECT_TRUE(client.atEnd());
+  const std::string pid = std::to_string(::getpid());
+  const std::string see = ", see \"kytctl entitlements check --pid " + pid + "\",";
+  EXPECT_EQ(server.sink.count(LogLevel::debug, "of process " + pid + ", user " + std::to_string(::getuid())),
+            2U);
+  EXPECT_EQ(server.sink.count(LogLevel::debug, see), 1U);
+}
+
 TEST(DBusServer, AnOrderlyEndInvalidatesWithoutInterruption) {
   Server server;
   PlainClient client(server.path);

@@ -157,7 +157,9 @@ class Server final : public ListenerDelegate {
     std::filesystem::remove_all(folder);
   }
   bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
-    if (!connection->entitlementValue("com.vantu.private.kytreportingd").boolValue()) return false;
+    const bool entitled = connection->entitlementValue("com.vantu.private.kytreportingd").boolValue();
+    log.debug("offered: %s", connection->description().c_str());
+    if (!entitled) return false;
     auto session = std::make_shared<RecordingSession>(connection);
     connection->setExportedObject(session);
     connection->setInterruptionHandler([session] { session->note("interrupted"); });

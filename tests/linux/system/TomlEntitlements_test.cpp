@@ -9,6 +9,9 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <fstream>
+#include <regex>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -222,11 +225,20 @@ TEST_F(TomlEntitlementsTest, AProcessThatHasEndedIsNobody) {
 
 class RefusingInspector final : public ProgramInspector {
  public:
-  std::variant<ProgramIdentity, int> runningProgram(int32_t) override { return EACCES; }
+  explicit RefusingInspector(int error) : error_(error) {}
+  std::variant<ProgramIdentity, int> runningProgram(int32_t) override {
+    ++asked;
+    return error_;
+  }
+  std::string programPath(int32_t) override { return {}; }
+  int asked = 0;
+
+ private:
+  const int error_;
 };
 
 TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatIsToldOnce) {
-  RefusingInspector refusing;
+  RefusingInspector refusing(EACCES);
   TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_);
   grant("executable = \"/proc/self/exe\"\n");
   PeerCredentials self = peer(1);
@@ -234,6 +246,65 @@ TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatI
   for (int i = 0; i < 3; ++i) EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
   EXPECT_EQ(
       sink_.count(LogLevel::error, "entitlements: Grants by executable cannot match: Permission denied"), 1u);
+}
+
+// A mount of /proc that hides other users' processes.
+TEST_F(TomlEntitlementsTest, AProcessThatIsHiddenIsALackOfPrivilegeToo) {
+  RefusingInspector hidden(ESRCH);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, hidden, log_, counters_);
+  grant("executable = \"/proc/self/exe\"\n");
+  PeerCredentials self = peer(1);
+  self.pidfd = pidfdOf(::getpid());
+  EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
+  EXPECT_EQ(sink_.count(LogLevel::error, "entitlements: Grants by executable cannot match: No such process"),
+            1u);
+}
+
+TEST_F(TomlEntitlementsTest, AProcessThatIsEndingIsNoLackOfPrivilege) {
+  RefusingInspector ending(ENOENT);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, ending, log_, counters_);
+  grant("executable = \"/proc/self/exe\"\n");
+  PeerCredentials self = peer(1);
+  self.pidfd = pidfdOf(::getpid());
+  EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
+  EXPECT_TRUE(sink_.lines().empty());
+}
+
+TEST_F(TomlEntitlementsTest, AsksOnceForAConnectionWhatItRuns) {
+  RefusingInspector refusing(EACCES);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_);
+  for (const char* name : {"a.toml", "b.toml", "c.toml"}) grant("executable = \"/proc/self/exe\"\n", name);
+  PeerCredentials self = peer(1);
+  self.pidfd = pidfdOf(::getpid());
+  EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
+  EXPECT_EQ(refusing.asked, 1);
+}
+
+TEST_F(TomlEntitlementsTest, ATrueValueCountsMoreThanAFalseOne) {
+  grant("user = 5\n\"com.vantu.other\" = false\n", "a.toml");
+  folder_.write("b.toml", "[[grant]]\nuser = 5\n\"com.vantu.other\" = true\n");
+  EXPECT_TRUE(entitlements_.valueFor(peer(5), "com.vantu.other").boolValue());
+  folder_.write("b.toml", "[[grant]]\nuser = 6\n\"com.vantu.other\" = true\n");
+  const Value no = entitlements_.valueFor(peer(5), "com.vantu.other");
+  EXPECT_FALSE(no.isNull());
+  EXPECT_FALSE(no.boolValue());
+}
+
+// The number that stands for nobody, and for a peer that the kernel does not name.
+TEST_F(TomlEntitlementsTest, NobodysNumberMatchesNobody) {
+  grant("user = 4294967295\n");
+  EXPECT_FALSE(isGranted(peer(UINT32_MAX)));
+  grant("group = 4294967295\n");
+  EXPECT_FALSE(isGranted(peer(UINT32_MAX, UINT32_MAX)));
+  grant("user = 4294967294\n");
+  EXPECT_TRUE(isGranted(peer(UINT32_MAX - 1)));
+}
+
+TEST_F(TomlEntitlementsTest, TellsTheProgramOfALivingPeerOnly) {
+  PeerCredentials self = peer(1);
+  EXPECT_EQ(entitlements_.executableOf(self), "") << "the number alone may be another's";
+  self.pidfd = pidfdOf(::getpid());
+  EXPECT_EQ(entitlements_.executableOf(self), std::filesystem::read_symlink("/proc/self/exe").string());
 }
 
 TEST_F(TomlEntitlementsTest, AnswersSeveralThreadsWhileFilesChange) {
@@ -274,15 +345,31 @@ TEST(ProgramInspectorProcess, EndsWithTheDaemonHoweverThatEnds) {
       "");
 }
 
+TEST(ProgramInspectorProcess, CanOpenNothing) {
+  auto started = ProgramInspectorProcess::start();
+  ASSERT_EQ(started.index(), 0u);
+  EXPECT_EQ(std::get<0>(started)->runningProgram(::getpid()).index(), 0u);  // it has finished starting
+  pid_t inspector = 0;
+  std::ifstream("/proc/thread-self/children") >> inspector;
+  ASSERT_GT(inspector, 0);
+  std::ifstream limits("/proc/" + std::to_string(inspector) + "/limits");
+  std::string found;
+  for (std::string line; std::getline(limits, line);)
+    if (line.starts_with("Max open files")) found = line;
+  EXPECT_TRUE(std::regex_search(found, std::regex("Max open files +0 +0 "))) << found;
+}
+
 TEST(ProgramInspectorProcess, AnswersLikeAskingDirectly) {
   auto started = ProgramInspectorProcess::start();
   ASSERT_EQ(started.index(), 0u);
   ProgramInspector& inspector = *std::get<0>(started);
   DirectProgramInspector direct;
   EXPECT_EQ(inspector.runningProgram(::getpid()), direct.runningProgram(::getpid()));
+  EXPECT_EQ(inspector.programPath(::getpid()), direct.programPath(::getpid()));
+  EXPECT_EQ(inspector.programPath(INT32_MAX), "");
   EXPECT_EQ(std::get<int>(inspector.runningProgram(0)), ESRCH);
   EXPECT_EQ(std::get<int>(inspector.runningProgram(-5)), ESRCH);
-  EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ENOENT);
+  EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ESRCH);
 }
 
 }  // namespace

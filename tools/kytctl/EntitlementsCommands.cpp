@@ -1,0 +1,442 @@
+// Why a client is served or refused: the files and grants of entitlements.d, matched as the daemon matches them and told
+// criterion by criterion. Run by root it reads the files as the daemon's user, so that what that user cannot read counts
+// for nothing here too.
+#include <fcntl.h>
+#include <grp.h>
+#include <poll.h>
+#include <pwd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+#include <cstdarg>
+#include <cstdio>
+#include <fstream>
+#include <sstream>
+#include <string_view>
+
+#include "platform/Counters.h"
+#include "platform/Keys.h"
+#include "platform/Log.h"
+#include "platform/TextEscape.h"
+#include "platform/linux/base/Descriptors.h"
+#include "platform/linux/system/EntitlementMatch.h"
+#include "platform/linux/system/LogSinks.h"
+#include "platform/linux/system/TomlEntitlements.h"
+#include "tools/kytctl/Commands.h"
+
+#ifndef SO_PEERPIDFD
+#define SO_PEERPIDFD 77
+#endif
+
+namespace kyt::tools {
+
+namespace {
+
+constexpr int kGranted = 0, kRefused = 1, kCannotTell = 2;
+
+__attribute__((format(printf, 1, 2))) void say(const char* format, ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  char text[4096];
+  std::vsnprintf(text, sizeof text, format, arguments);
+  va_end(arguments);
+  std::printf("%s\n", escapedText(text).c_str());
+}
+
+int cannotTell(const std::string& why) {
+  say("cannot tell: %s", why.c_str());
+  return kCannotTell;
+}
+
+// ---- The client.
+
+struct Client {
+  PeerCredentials peer;
+  Descriptor process;      // to see that it has not ended meanwhile; empty for a user
+  std::string program;     // what its link says; empty when that may not be known
+  bool isProcess = false;  // otherwise any process of a user: its program and its label are not known
+};
+
+std::string named(const std::string& name, uint32_t number) {
+  return name.empty() ? std::to_string(number) : name + " (" + std::to_string(number) + ")";
+}
+std::string userText(uint32_t number) {
+  const passwd* const entry = ::getpwuid(number);
+  return named(entry == nullptr ? "" : entry->pw_name, number);
+}
+std::string groupText(uint32_t number) {
+  const group* const entry = ::getgrgid(number);
+  return named(entry == nullptr ? "" : entry->gr_name, number);
+}
+std::string groupsText(const Client& client) {
+  std::string text = groupText(client.peer.gid);
+  for (const uint32_t number : client.peer.groups)
+    if (number != client.peer.gid) text += ", " + groupText(number);
+  return text;
+}
+
+std::string labelOf(const std::string& folder) {
+  std::ifstream file(folder + "/attr/current", std::ios::binary);
+  std::string label;
+  std::getline(file, label);
+  return label.substr(0, label.find('\0'));
+}
+
+bool readStatus(const std::string& folder, PeerCredentials& peer) {
+  std::ifstream status(folder + "/status");
+  int found = 0;
+  for (std::string line; std::getline(status, line);) {
+    std::istringstream words(line);
+    std::string key;
+    uint32_t real = 0, number = 0;
+    words >> key;
+    if (key == "Uid:" && words >> real >> peer.uid) ++found;
+    if (key == "Gid:" && words >> real >> peer.gid) ++found;
+    if (key != "Groups:") continue;
+    while (words >> number) peer.groups.push_back(number);
+    ++found;
+  }
+  return found == 3;
+}
+
+bool hasEnded(const Descriptor& process) {
+  pollfd wanted = {process.get(), POLLIN, 0};
+  return process.get() >= 0 && ::poll(&wanted, 1, 0) != 0;
+}
+
+// Whether the kernel tells the daemon which process is at the other end of a connection.
+bool kernelTellsProcess() {
+  int ends[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return true;
+  const Descriptor one = ownDescriptor(ends[0]), other = ownDescriptor(ends[1]);
+  int pidfd = -1;
+  socklen_t size = sizeof pidfd;
+  if (::getsockopt(one.get(), SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) != 0) return errno != ENOPROTOOPT;
+  const Descriptor closed = ownDescriptor(pidfd);
+  return true;
+}
+
+Descriptor openProcess(int32_t pid) {
+  return ownDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+}
+
+// The descriptor comes first: alive in the end means that the number stood for this process all the time.
+std::variant<Client, std::string> clientOfProcess(int32_t pid) {
+  Client client;
+  client.isProcess = true;
+  client.process = openProcess(pid);
+  if (client.process.get() < 0)
+    return errno == ESRCH ? "there is no process " + std::to_string(pid) : errorText(errno);
+  if (kernelTellsProcess()) client.peer.pidfd = openProcess(pid);
+  const std::string folder = "/proc/" + std::to_string(pid);
+  client.peer.pid = pid;
+  if (!readStatus(folder, client.peer)) return "process " + std::to_string(pid) + " cannot be looked at";
+  client.peer.securityLabel = labelOf(folder);
+  char target[4096];
+  const ssize_t length = ::readlink((folder + "/exe").c_str(), target, sizeof target);
+  if (length > 0) client.program.assign(target, static_cast<size_t>(length));
+  return client;
+}
+
+std::variant<Client, std::string> clientOfUser(const std::string& text) {
+  int64_t number = 0;
+  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number);
+  const bool isNumber = parsed.ec == std::errc() && parsed.ptr == text.data() + text.size();
+  const auto user = userNumber(isNumber ? NameOrNumber(number) : NameOrNumber(text));
+  if (!user) return "there is no user \"" + text + "\"";
+  Client client;
+  client.peer.uid = client.peer.gid = *user;
+  const passwd* const entry = ::getpwuid(*user);
+  if (entry == nullptr) return client;
+  client.peer.gid = entry->pw_gid;
+  std::vector<gid_t> groups(65536);
+  int count = static_cast<int>(groups.size());
+  if (::getgrouplist(entry->pw_name, entry->pw_gid, groups.data(), &count) >= 0)
+    client.peer.groups.assign(groups.begin(), groups.begin() + count);
+  return client;
+}
+
+void sayClient(const Client& client) {
+  if (client.isProcess)
+    say("process %d runs %s", client.peer.pid,
+        client.program.empty() ? "a program that may not be looked at" : client.program.c_str());
+  say("user %s, groups %s", userText(client.peer.uid).c_str(), groupsText(client).c_str());
+  if (!client.peer.securityLabel.empty()) say("security label %s", client.peer.securityLabel.c_str());
+}
+
+// ---- The daemon's user.
+
+struct DaemonUser {
+  std::string name;
+  uid_t user;
+  gid_t group;
+};
+
+// While it exists root reads files as the daemon's user does.
+class AsDaemon {
+ public:
+  explicit AsDaemon(const std::optional<DaemonUser>& daemon) {
+    if (::geteuid() != 0 || !daemon || daemon->user == 0) return;
+    groups_.resize(static_cast<size_t>(std::max(0, ::getgroups(0, nullptr))));
+    if (::getgroups(static_cast<int>(groups_.size()), groups_.data()) < 0) return;
+    changed_ = ::initgroups(daemon->name.c_str(), daemon->group) == 0 && ::setegid(daemon->group) == 0 &&
+               ::seteuid(daemon->user) == 0;
+  }
+  ~AsDaemon() {
+    if (!changed_) return;
+    if (::seteuid(0) != 0 || ::setegid(0) != 0 || ::setgroups(groups_.size(), groups_.data()) != 0)
+      ::_exit(kCannotTell);
+  }
+  AsDaemon(const AsDaemon&) = delete;
+  AsDaemon& operator=(const AsDaemon&) = delete;
+
+ private:
+  std::vector<gid_t> groups_;
+  bool changed_ = false;
+};
+
+// The daemon asks a helper that may look at every process; here that is root, when this is run by root.
+class OwnInspector final : public ProgramInspector {
+ public:
+  std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override {
+    const uid_t user = ::geteuid();
+    const bool root = ::getuid() == 0 && user != 0 && ::seteuid(0) == 0;
+    auto program = direct_.runningProgram(pid);
+    if (root && ::seteuid(user) != 0) ::_exit(kCannotTell);
+    return program;
+  }
+  std::string programPath(int32_t pid) override { return direct_.programPath(pid); }
+
+ private:
+  DirectProgramInspector direct_;
+};
+
+// Who owns the daemon's state.
+std::optional<DaemonUser> daemonUser(const std::string& root) {
+  struct stat status = {};
+  for (const char* folder : {"/var/lib/kytreportingd/defaults", "/var/lib/kytreportingd"})
+    if (::stat((root + folder).c_str(), &status) == 0) {
+      const passwd* const entry = ::getpwuid(status.st_uid);
+      if (entry != nullptr) return DaemonUser{entry->pw_name, entry->pw_uid, entry->pw_gid};
+    }
+  return std::nullopt;
+}
+
+// ---- The grants.
+
+std::string text(const NameOrNumber& who) {
+  const auto* const name = std::get_if<std::string>(&who);
+  return name != nullptr ? "\"" + *name + "\"" : std::to_string(std::get<int64_t>(who));
+}
+
+std::string text(const ProgramIdentity& program) {
+  return "device " + std::to_string(major(program.device)) + ":" + std::to_string(minor(program.device)) +
+         ", inode " + std::to_string(program.inode);
+}
+
+std::string text(const Value& value) {
+  if (value.kind() == Value::Kind::boolean) return value.boolValue() ? "true" : "false";
+  return description(value);
+}
+
+enum class Answer : uint8_t { matches, unknown, differs };  // of several the last counts
+
+class Check {
+ public:
+  Check(const Client& client, bool servicesView, ProgramInspector& inspector)
+      : client_(client), servicesView_(servicesView), match_(client.peer, inspector) {}
+
+  // Tells each criterion; all of them, so that a second fault is seen before the first is mended.
+  Answer grant(const EntitlementGrant& grant) {
+    answer_ = Answer::matches;
+    if (grant.user)
+      tell("user " + text(*grant.user), match_.isUser(*grant.user),
+           userNumber(*grant.user) ? "the client is " + userText(client_.peer.uid) : "there is no such user");
+    if (grant.group)
+      tell("group " + text(*grant.group), match_.isMember(*grant.group),
+           groupNumber(*grant.group) ? "the client is in " + groupsText(client_) : "there is no such group");
+    if (grant.securityLabel) label(*grant.securityLabel);
+    if (grant.executable) executable(*grant.executable);
+    return answer_;
+  }
+
+ private:
+  void tell(const std::string& criterion, Answer answer, const std::string& why) {
+    const char* const verb = answer == Answer::matches   ? "matches"
+                             : answer == Answer::differs ? "does not match"
+                                                         : "cannot be judged";
+    say("    %s: %s%s%s", criterion.c_str(), verb, why.empty() ? "" : ": ", why.c_str());
+    answer_ = std::max(answer_, answer);
+  }
+  void tell(const std::string& criterion, bool matches, const std::string& why) {
+    tell(criterion, matches ? Answer::matches : Answer::differs, matches ? "" : why);
+  }
+
+  void label(const std::string& wanted) {
+    const std::string criterion = "security_label \"" + wanted + "\"";
+    if (!client_.isProcess) return tell(criterion, Answer::unknown, "it depends on the process");
+    const std::string& own = client_.peer.securityLabel;
+    tell(criterion, match_.hasLabel(wanted),
+         own.empty() ? "the client has none" : "the client's is \"" + own + "\"");
+  }
+
+  void executable(const std::string& wanted) {
+    using Program = EntitlementMatch::Program;
+    const std::string criterion = "executable \"" + wanted + "\"";
+    if (!client_.isProcess) return tell(criterion, Answer::unknown, "it depends on the process");
+    const auto result = match_.runs(wanted);
+    switch (result.program) {
+      case Program::matches:
+        tell(criterion, Answer::matches, text(result.running));
+        break;
+      case Program::otherProgram:
+        tell(criterion, Answer::differs, otherProgram(result));
+        break;
+      case Program::missing:
+        tell(criterion, Answer::differs,
+             "the daemon's user cannot see that file (" + errorText(result.error) + ")");
+        break;
+      case Program::processEnded:
+        tell(criterion, Answer::unknown, "the process has ended");
+        break;
+      case Program::unknown:
+        if (result.error == 0)
+          tell(criterion, Answer::differs,
+               "the kernel does not tell the daemon which process is connected (Linux 6.5 does)");
+        else
+          tell(criterion, Answer::unknown, errorText(result.error) + " (run this as root)");
+        break;
+    }
+    noteHidden(wanted);
+  }
+
+  [[nodiscard]] std::string otherProgram(const EntitlementMatch::ProgramResult& result) const {
+    const bool replaced = client_.program.ends_with(" (deleted)");
+    return "the client runs " + (client_.program.empty() ? "another file" : client_.program) + " (" +
+           text(result.running) + "), this is " + text(result.wanted) +
+           (replaced ? ". The client's file was replaced or removed since it was started: start it again"
+                     : "");
+  }
+
+  void noteHidden(const std::string& path) const {
+    if (!servicesView_) return;
+    for (const char* hidden : {"/home/", "/root/", "/run/user/", "/tmp/", "/var/tmp/"})
+      if (path.starts_with(hidden))
+        say("      note: as a service (kytreportingd.service) the daemon does not see %.*s, and this never matches",
+            static_cast<int>(std::string_view(hidden).size()) - 1, hidden);
+  }
+
+  const Client& client_;
+  const bool servicesView_;
+  EntitlementMatch match_;
+  Answer answer_ = Answer::matches;
+};
+
+// What the files say together.
+struct Outcome {
+  bool mayBeGranted = false;  // something that counts could not be judged or read
+};
+
+void checkGrants(const EntitlementsFile& file, Check& check, Outcome& outcome) {
+  for (const EntitlementGrant& grant : file.grants) {
+    const auto value = grant.values.find(kEntitlement);
+    if (value == grant.values.end()) {
+      say("  line %u: grants other entitlements only", grant.line);
+      continue;
+    }
+    say("  line %u: %s = %s", grant.line, std::string(kEntitlement).c_str(), text(value->second).c_str());
+    const Answer answer = check.grant(grant);
+    const bool grants = value->second.boolValue();
+    outcome.mayBeGranted |= answer == Answer::unknown && grants;
+    say("    so it %s", answer == Answer::unknown   ? "cannot be judged"
+                        : answer == Answer::differs ? "does not match"
+                        : grants                    ? "matches, and grants it"
+                                                    : "matches, and that value is no");
+  }
+}
+
+void checkFile(const EntitlementsFile& file, Check& check, Outcome& outcome) {
+  say("%s", file.path.c_str());
+  for (const TomlError& problem : file.problems) say("  %s", problem.text.c_str());
+  if (file.ignored && file.identity.exists())
+    say("  its mode is %04o, its owner %s", file.identity.mode & 07777U,
+        userText(file.identity.owner).c_str());
+  if (!file.ignored && file.grants.empty()) say("  has no grant");
+  checkGrants(file, check, outcome);
+}
+
+class NoSink final : public LogSink {
+ public:
+  void write(LogLevel /*level*/, std::string_view /*line*/) override {}
+};
+
+// As the daemon answers it.
+bool isGranted(const TomlEntitlementsOptions& options, const PeerCredentials& peer,
+               ProgramInspector& inspector) {
+  NoSink sink;
+  Log log(sink);
+  Counters counters;
+  TomlEntitlements entitlements(options, inspector, log, counters);
+  return entitlements.valueFor(peer, kEntitlement).boolValue();
+}
+
+int verdict(bool granted, bool mayBeGranted, const Client& client) {
+  if (client.isProcess && hasEnded(client.process)) return cannotTell("the process has ended meanwhile");
+  if (granted) {
+    say("granted: this client is served");
+    return kGranted;
+  }
+  if (mayBeGranted) return cannotTell("it depends on what could not be judged above");
+  say("refused: no grant matches");
+  return kRefused;
+}
+
+}  // namespace
+
+int entitlementsCheckCommand(const std::string& root, const CheckOptions& options) {
+  if (options.user.empty() == (options.pid == 0)) {
+    failed("say either --pid or --user");
+    return kCannotTell;
+  }
+  auto found = options.pid != 0 ? clientOfProcess(options.pid) : clientOfUser(options.user);
+  if (const auto* wrong = std::get_if<std::string>(&found)) return cannotTell(*wrong);
+  const Client& client = std::get<Client>(found);
+  sayClient(client);
+
+  const auto daemon = daemonUser(root);
+  TomlEntitlementsOptions files{root + "/etc/kytreportingd/entitlements.d", std::nullopt};
+  if (!root.empty()) files.trustedUser = daemon ? daemon->user : ::geteuid();
+  OwnInspector inspector;
+  bool granted = false;
+  Outcome outcome;
+  {
+    const AsDaemon view(daemon);
+    const bool isDaemonsView = daemon && daemon->user == ::geteuid();
+    if (isDaemonsView) say("files are read as the daemon's user, %s", userText(::geteuid()).c_str());
+    const EntitlementsListing listing = entitlementsFiles(files.folder);
+    if (listing.error != 0) {
+      say("%s: %s", files.folder.c_str(), errorText(listing.error).c_str());
+      outcome.mayBeGranted = listing.error != ENOENT && !isDaemonsView;
+    }
+    Check check(client, root.empty(), inspector);
+    for (const std::string& name : listing.names) {
+      const EntitlementsFile file = readEntitlementsFile(files.folder + "/" + name, files.trustedUser);
+      outcome.mayBeGranted |= file.unreadable && !isDaemonsView;
+      checkFile(file, check, outcome);
+    }
+    for (const std::string& name : listing.others) {
+      say("%s/%s", files.folder.c_str(), name.c_str());
+      say("  is not read: its name must end in .toml and not begin with a point");
+    }
+    granted = isGranted(files, client.peer, inspector);
+  }
+  return verdict(granted, outcome.mayBeGranted, client);
+}
+
+}  // namespace kyt::tools
