@@ -326,10 +326,10 @@ class Check {
 
   void noteHidden(const std::string& path) const {
     if (!servicesView_) return;
-    for (const char* hidden : {"/home/", "/root/", "/run/user/", "/tmp/", "/var/tmp/"})
-      if (path.starts_with(hidden))
-        say("      note: as a service (kytreportingd.service) the daemon does not see %.*s, and this never matches",
-            static_cast<int>(std::string_view(hidden).size()) - 1, hidden);
+    for (const char* hidden : {"/home", "/root", "/run/user", "/tmp", "/var/tmp"})
+      if (path.starts_with(std::string(hidden) + "/"))
+        say("      note: as a service (kytreportingd.service) the daemon does not see %s, and this never matches",
+            hidden);
   }
 
   const Client& client_;
