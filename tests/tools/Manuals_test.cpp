@@ -178,11 +178,11 @@ TEST(ManualOfTheDaemon, NamesEachCounter) {
 }
 
 TEST(AdministratorsGuide, NamesEachCounter) {
-  std::string guide = textOf("docs/ADMINISTRATION.md");
+  const std::string guide = textOf("docs/ADMINISTRATION.md");
   const size_t at = guide.find("\n## Counters\n");
   ASSERT_NE(at, std::string::npos);
   std::string rows;
-  for (const std::string& line : linesOf(guide.substr(at)))
+  for (const std::string& line : linesOf(guide.substr(at, guide.find("\n## ", at + 1) - at)))
     if (line.starts_with("| `")) rows += line.substr(0, line.find('|', 1)) + "\n";
   EXPECT_EQ(matchesIn(rows, "`([a-z-]+)`"), counters());
 }
