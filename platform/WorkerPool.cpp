@@ -21,6 +21,12 @@
 
 namespace kyt {
 
+namespace {
+
+constexpr Duration kRefusedPause = std::chrono::milliseconds(10);
+
+}  // namespace
+
 struct WorkerPool::Worker final : BlockingObserver {
   static thread_local Worker* current;
   Implementation* pool = nullptr;
@@ -67,6 +73,8 @@ class WorkerPool::Implementation {
   void tellExhausted();
   [[nodiscard]] bool ownerMayRun(uint64_t owner) REQUIRES(mutex_);
   [[nodiscard]] Worker* workerToWake() REQUIRES(mutex_);
+  [[nodiscard]] bool nobodyComes() const REQUIRES(mutex_) { return !ready_.empty() && workers_ == 0; }
+  void insistOnAWorker();
   void start() REQUIRES(mutex_);
 
   WorkerPoolOptions options_;  // constant, like the next
@@ -93,6 +101,7 @@ class WorkerPool::Implementation {
 
 void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
   Worker* toWake = nullptr;
+  bool stranded = false;
   {
     MutexLock lock(mutex_);
     if (!stopping_) {
@@ -100,10 +109,33 @@ void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
       const bool looksNext = Worker::current != nullptr && Worker::current->queue == queue.get();
       ready_.push_back(std::move(queue));
       if (!looksNext) toWake = workerToWake();
+      stranded = nobodyComes();
     }
   }
   if (toWake != nullptr) toWake->wake.notifyOne();
+  if (stranded) insistOnAWorker();
   if (queue) queue->discardPending();  // NOLINT(bugprone-use-after-move): null when it was moved
+}
+
+// The system refused a thread, and there is no worker that would look for work when it is done: what is ready would
+// wait until something else happens, and that may be never (a listener is armed again by the very work that waits).
+// Better that the caller waits.
+void WorkerPool::Implementation::insistOnAWorker() {
+  if (options_.log != nullptr)
+    options_.log->error("WorkerPool(submit): the system refuses a thread, work waits");
+  for (;;) {
+    std::this_thread::sleep_for(kRefusedPause);
+    Worker* toWake = nullptr;
+    bool stranded = false;
+    {
+      MutexLock lock(mutex_);
+      if (stopping_) return;
+      toWake = workerToWake();
+      stranded = nobodyComes();
+    }
+    if (toWake != nullptr) toWake->wake.notifyOne();
+    if (!stranded) return;
+  }
 }
 
 // Counts a sleeping worker as looking and returns it, or starts one, if work waits that no worker would see

@@ -2,11 +2,15 @@
 #include "platform/WorkerPool.h"
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <atomic>
+#include <fstream>
 #include <mutex>
 #include <set>
 #include <string>
+#include <system_error>
 #include <thread>
 #include <vector>
 
@@ -16,6 +20,7 @@
 #include "platform/SerialQueue.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/Sanitizers.h"
 
 namespace kyt {
 namespace {
@@ -42,6 +47,41 @@ TEST(WorkerPool, RunsWorkOnAThreadOfItsOwn) {
   });
   ASSERT_TRUE(done.waitFor(kDeadline));
   EXPECT_NE(ranOn, std::this_thread::get_id());
+}
+
+// A pool whose workers have all ended, and a system that refuses a new one for a while.
+TEST(WorkerPool, WorkThatFoundNoThreadRunsAsSoonAsThereIsOne) {
+  if (kSanitized) GTEST_SKIP() << "a sanitizer takes more address space than any limit";
+  MemoryLogSink sink;
+  Log log(sink);
+  WorkerPoolOptions o = options(2);
+  o.log = &log;
+  WorkerPool pool(o);
+  auto queue = SerialQueue::create("test", pool);
+  rlimit before{};
+  ASSERT_EQ(getrlimit(RLIMIT_AS, &before), 0);
+  std::thread relief([&] {
+    EXPECT_TRUE(eventually([&] { return sink.count("the system refuses a thread") > 0; }));
+    setrlimit(RLIMIT_AS, &before);
+  });
+  size_t pages = 0;
+  std::ifstream("/proc/self/statm") >> pages;
+  rlimit tight = before;
+  tight.rlim_cur = pages * static_cast<size_t>(getpagesize()) + (6u << 20);  // less than a thread's stack
+  Semaphore over;
+  std::vector<std::thread> others;  // take what stacks the library has kept
+  others.reserve(64);
+  ASSERT_EQ(setrlimit(RLIMIT_AS, &tight), 0);
+  try {
+    while (others.size() < 64) others.emplace_back([&] { over.wait(); });
+  } catch (const std::system_error&) {
+  }
+  Semaphore done;
+  queue->async([&] { done.signal(); });
+  relief.join();
+  EXPECT_TRUE(done.waitFor(kDeadline));
+  for (size_t i = 0; i < others.size(); ++i) over.signal();
+  for (std::thread& other : others) other.join();
 }
 
 TEST(WorkerPool, NamesItsThreads) {
