@@ -42,7 +42,7 @@ class FileExtensionTest : public testing::Test {
   }
   std::unique_ptr<FileAccess> access(int file) {
     auto given = extension(file);
-    return LinuxFileExtensions(broker_.get(), log_, counters_).consume("token", given);
+    return extensions_->consume("token", given);
   }
   std::unique_ptr<FileAccess> access(const std::string& path, int flags = O_RDONLY) {
     const int file = ::open(path.c_str(), flags | O_CLOEXEC | O_NONBLOCK, 0600);
