@@ -80,8 +80,10 @@ std::optional<Error> Stage::layOut() {
     if (error) return failure(options_.folder + folder + ": " + error.message());
   }
   const std::string share = options_.folder + "/usr/share/kytreporting";
-  fs::copy(options_.share + "/kytreporting", share,
-           fs::copy_options::recursive | fs::copy_options::overwrite_existing, error);
+  fs::copy(
+      options_.share + "/kytreporting", share,
+      fs::copy_options::recursive | fs::copy_options::overwrite_existing | fs::copy_options::skip_symlinks,
+      error);  // an installed bundle has a link for the key, which the stage brings itself
   if (error) return failure(options_.share + "/kytreporting: " + error.message());
   auto made = makeKeyPair(2048);
   if (auto* problem = std::get_if<Error>(&made)) return *problem;
