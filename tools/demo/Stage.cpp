@@ -130,7 +130,9 @@ std::optional<Error> Stage::writeConfiguration() {
   if (auto error = writeFile(etc + "entitlements.d/stage.toml", grant, 0644)) return error;
   std::string device =
       "ProductVersion = \"12.1\"\nBuildVersion = \"12B7\"\nProductType = \"Board7,1\"\n"
-      "DeviceName = \"Demo Device\"\nHWModelStr = \"B7\"\nSerialNumber = \"KYT0001\"\n";
+      "DeviceName = \"Demo Device\"\nHWModelStr = \"B7\"\nSerialNumber = \"KYT0001\"\n"
+      // Containers often have no machine identifier that it could come from.
+      "UniqueDeviceID = \"00d3300d3300d3300d3300d3300d3300d3300d33\"\n";
   if (!options_.country.empty()) device += "country = \"" + options_.country + "\"\n";
   if (options_.internalBuild) device += "ReleaseType = \"Internal\"\n";
   if (auto error = writeFile(etc + "device.toml", device, 0644)) return error;
