@@ -1,0 +1,54 @@
+// What one batched event costs without sockets and system calls, from the bytes of its call into the batch
+// (Pipeline.h), and with the end of its record: the blocks of one batch are those of the last one, as in a
+// daemon that runs for long. The reference is the decoding of the same calls alone. Both print the processor
+// time of one event.
+#include <benchmark/benchmark.h>
+
+#include <span>
+
+#include "bench/Corpus.h"
+#include "bench/Pipeline.h"
+#include "platform/ipc/BodyReader.h"
+#include "platform/ipc/MessageReader.h"
+
+namespace kyt::bench {
+namespace {
+
+void socketlessEventToBatch(benchmark::State& state) {
+  Pipeline pipeline;
+  if (!pipeline.isLive()) return state.SkipWithError("no back end is live");
+  size_t events = 0;
+  for (auto _ : state) {
+    pipeline.fillBatch();
+    pipeline.discardBatch();
+    events += Pipeline::kEvents;
+  }
+  pipeline.fillBatch();
+  if (pipeline.batchedBytes() < Pipeline::kEvents * 100) state.SkipWithError("the events did not arrive");
+  state.SetItemsProcessed(static_cast<int64_t>(events));
+}
+BENCHMARK(socketlessEventToBatch);
+
+void decodeAlone(benchmark::State& state) {
+  std::vector<std::string> calls;
+  for (const Dictionary& payload : corpusPayloads(Pipeline::kEvents))
+    appendEventCall(calls.emplace_back(), 1000, 7, payload);
+  size_t events = 0;
+  for (auto _ : state) {
+    for (const std::string& call : calls) {
+      Message message;
+      const Frame frame = readMessage(std::as_bytes(std::span(call)), 1048576, message);
+      BodyReader reader(message);
+      Dictionary dictionary;
+      if (frame.status != FrameStatus::complete || !reader.readDictionary(dictionary))
+        state.SkipWithError("the call was not decoded");
+      benchmark::DoNotOptimize(dictionary);
+    }
+    events += calls.size();
+  }
+  state.SetItemsProcessed(static_cast<int64_t>(events));
+}
+BENCHMARK(decodeAlone);
+
+}  // namespace
+}  // namespace kyt::bench
