@@ -139,11 +139,16 @@ void SerialQueue::enterContended() {
     std::fprintf(stderr, "SerialQueue(sync): called from the queue \"%s\" onto itself\n", label_);
     std::abort();
   }
+  if (takePending()) return runReady(~0u);  // nobody runs it: work was left for later
+  enterAfterOthers();
+}
+
+void SerialQueue::enterAfterOthers() {
   Waiter waiter;
   for (int spin = 0;; ++spin) {
+    spinPause();
     if (takePending()) return runReady(~0u);
     if (spin >= kSpins && waitInLine(waiter)) break;
-    spinPause();
   }
   for (int spin = 0; spin < kSpins && waiter.granted.load(std::memory_order_acquire) == 0; ++spin)
     spinPause();

@@ -78,6 +78,7 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
   void enter();  // waits until this thread is the one that runs the queue, and runs what came before
   void leave();
   void enterContended();
+  void enterAfterOthers();
   void leaveWithWork(bool mayDefer);
   bool takePending(bool keepsPromise = false);
   bool waitInLine(Waiter& waiter);

@@ -254,6 +254,13 @@ Dictionary Dictionary::takingOver(DictionaryEntry* entries, size_t count) {
   return taken;
 }
 
+Value Dictionary::take(std::string_view key) noexcept {
+  const Value* found = find(key);
+  if (found == nullptr) return {};
+  if (!detail::isUnique(block_)) return *found;
+  return std::move(*const_cast<Value*>(found));
+}
+
 bool Dictionary::remove(std::string_view key) {
   const Value* found = find(key);
   if (found == nullptr) return false;

@@ -205,7 +205,10 @@ class KYT_OBJECT Dictionary {
   // The value under a key or null; valid until the dictionary changes.
   [[nodiscard]] const Value* find(const String& key) const noexcept;
   [[nodiscard]] const Value* find(std::string_view key) const noexcept;
-  [[nodiscard]] const Value* find(const char* key) const noexcept { return find(std::string_view(key)); }
+  // Inlined always: the compiler makes the two words of a literal key.
+  [[nodiscard, gnu::always_inline]] const Value* find(const char* key) const noexcept {
+    return find(std::string_view(key));
+  }
   [[nodiscard]] const Value* find(const std::string& key) const noexcept {
     return find(std::string_view(key));
   }
@@ -215,11 +218,17 @@ class KYT_OBJECT Dictionary {
 
   void reserve(size_t capacity);  // unshares the block too
   void set(String key, Value value);
-  // For decoders and record builders that know the key is new: no look-up. Precondition: !contains(key).
-  void append(String key, Value value);
+  // For decoders and record builders that know the key is new: no look-up. Precondition: !contains(key). Key
+  // and value are made in their place: an object that is written as two words and at once copied as one makes
+  // the processor wait for its own stores.
+  template <typename Key, typename Content>
+  void append(Key&& key, Content&& value);
   // For decoders: a dictionary of exactly `count` entries with different keys, at most 32. They are moved out of raw
   // storage bit by bit, so the caller must not destroy them.
   static Dictionary takingOver(DictionaryEntry* entries, size_t count);
+  // For the last user of a dictionary that may be shared: the value under a key, or null, moved out of a block without
+  // other owners, which then holds null there.
+  [[nodiscard]] Value take(std::string_view key) noexcept;
   bool remove(std::string_view key);    // whether it was there
   void merge(const Dictionary& other);  // set() of each entry of other, in its order
   // Entries whose predicate (const String& key, Value& value) -> bool answers true are removed; the value may
@@ -269,16 +278,17 @@ class KYT_OBJECT Value {
       : Value(static_cast<unsigned long>(value)) {}  // NOLINT(google-explicit-constructor)
   Value(unsigned long value) noexcept;               // NOLINT(google-explicit-constructor)
   Value(unsigned long long value) noexcept : Value(static_cast<unsigned long>(value)) {}  // NOLINT
-  Value(double value) noexcept;                            // NOLINT(google-explicit-constructor)
-  Value(Date value) noexcept;                              // NOLINT(google-explicit-constructor)
-  Value(const char* text) : Value(String(text)) {}         // NOLINT(google-explicit-constructor)
-  Value(std::string_view text) : Value(String(text)) {}    // NOLINT(google-explicit-constructor)
-  Value(const std::string& text) : Value(String(text)) {}  // NOLINT(google-explicit-constructor)
-  Value(String text) noexcept;                             // NOLINT(google-explicit-constructor)
-  Value(Data data) noexcept;                               // NOLINT(google-explicit-constructor)
-  Value(Array array) noexcept;                             // NOLINT(google-explicit-constructor)
-  Value(Dictionary dictionary) noexcept;                   // NOLINT(google-explicit-constructor)
-  Value(const void*) = delete;                             // no pointer becomes a boolean
+  Value(double value) noexcept;                                      // NOLINT(google-explicit-constructor)
+  Value(Date value) noexcept;                                        // NOLINT(google-explicit-constructor)
+  Value(const char* text) : Value(std::string_view(text)) {}         // NOLINT(google-explicit-constructor)
+  Value(std::string_view text);                                      // NOLINT(google-explicit-constructor)
+  Value(const std::string& text) : Value(std::string_view(text)) {}  // NOLINT(google-explicit-constructor)
+  Value(const String& text) noexcept;                                // NOLINT(google-explicit-constructor)
+  Value(String&& text) noexcept;                                     // NOLINT(google-explicit-constructor)
+  Value(Data data) noexcept;                                         // NOLINT(google-explicit-constructor)
+  Value(Array array) noexcept;                                       // NOLINT(google-explicit-constructor)
+  Value(Dictionary dictionary) noexcept;                             // NOLINT(google-explicit-constructor)
+  Value(const void*) = delete;                                       // no pointer becomes a boolean
 
   Value(const Value& other) noexcept : cell_(other.cell_) {
     if (detail::ownsBlock(cell_)) detail::retain(cell_);

@@ -120,6 +120,14 @@ inline void makeInlineText(Cell& cell, const char* bytes, size_t size) noexcept 
 
 void makeHeapText(Cell& cell, std::string_view text);
 
+inline void makeText(Cell& cell, std::string_view text) {
+  if (text.size() <= kMaxInlineText) {
+    makeInlineText(cell, text.data(), text.size());
+  } else {
+    makeHeapText(cell, text);
+  }
+}
+
 inline std::string_view textOf(const Cell& cell) noexcept {
   if (cell.tag == kTagHeapString) return {cell.block->text(), cell.block->size};
   return {cell.text(), kMaxInlineText - cell.tag};
@@ -147,11 +155,7 @@ inline void makeScalar(Cell& cell, uint64_t word, Tag tag) noexcept {
 }  // namespace detail
 
 inline String::String(std::string_view text) {
-  if (text.size() <= detail::kMaxInlineText) {
-    detail::makeInlineText(cell_, text.data(), text.size());
-  } else {
-    detail::makeHeapText(cell_, text);
-  }
+  detail::makeText(cell_, text);
 }
 
 inline String& String::operator=(const String& other) noexcept {
@@ -216,7 +220,13 @@ inline Value::Value(double value) noexcept {
 inline Value::Value(Date value) noexcept {
   detail::makeScalar(cell_, std::bit_cast<uint64_t>(value.secondsSince1970), detail::kTagDate);
 }
-inline Value::Value(String text) noexcept : cell_(text.cell_) {
+inline Value::Value(std::string_view text) {
+  detail::makeText(cell_, text);
+}
+inline Value::Value(const String& text) noexcept : cell_(text.cell_) {
+  if (detail::ownsBlock(cell_)) detail::retain(cell_);
+}
+inline Value::Value(String&& text) noexcept : cell_(text.cell_) {
   text.makeEmpty();
 }
 inline Value::Value(Data data) noexcept {
@@ -386,7 +396,7 @@ inline const void* Dictionary::indexBlock() const noexcept {
   return block_ == nullptr ? nullptr : static_cast<detail::DictionaryBlock*>(block_)->index;
 }
 
-inline const Value* Dictionary::findInline(const detail::Cell& key) const noexcept {
+[[gnu::noinline]] inline const Value* Dictionary::findInline(const detail::Cell& key) const noexcept {
   auto* block = static_cast<detail::DictionaryBlock*>(block_);
   const uint64_t low = key.word;
   const uint64_t high = detail::secondWord(key);
@@ -401,7 +411,7 @@ inline const Value* Dictionary::find(const String& key) const noexcept {
     return findInline(key.cell_);
   return findSlowly(key.view());
 }
-inline const Value* Dictionary::find(std::string_view key) const noexcept {
+[[gnu::always_inline]] inline const Value* Dictionary::find(std::string_view key) const noexcept {
   if (block_ == nullptr) return nullptr;
   if (key.size() <= detail::kMaxInlineText && block_->size <= detail::kMaxScanned) {
     detail::Cell cell;
@@ -411,16 +421,17 @@ inline const Value* Dictionary::find(std::string_view key) const noexcept {
   return findSlowly(key);
 }
 
-inline void Dictionary::append(String key, Value value) {
-  assert(find(key) == nullptr);
+template <typename Key, typename Content>
+inline void Dictionary::append(Key&& key, Content&& value) {
+  assert(find(String(key)) == nullptr);
   auto* block = static_cast<detail::DictionaryBlock*>(block_);
   if (block == nullptr || block->size == block->capacity || block->size >= detail::kMaxScanned ||
-      !detail::isUnique(block)) {
-    appendSlowly(std::move(key), std::move(value));
+      !detail::isUnique(block)) [[unlikely]] {
+    appendSlowly(std::forward<Key>(key), std::forward<Content>(value));
     return;
   }
   ::new (static_cast<void*>(block->entries() + block->size))
-      DictionaryEntry{std::move(key), std::move(value)};
+      DictionaryEntry{String(std::forward<Key>(key)), Value(std::forward<Content>(value))};
   ++block->size;
 }
 

@@ -41,9 +41,10 @@ class EntryGatherer {
   [[nodiscard]] bool full() const { return count_ == kMost; }
   // Where the next entry is to be made, before gathered().
   [[nodiscard]] void* next() { return entries() + count_; }
-  void gathered() {
-    DictionaryEntry& entry = entries()[count_++];
-    const uint64_t bit = uint64_t{1} << hash(entry.key);
+  // `key`: as it lies in the message. Its bytes are older than those of the entry, which the processor may
+  // still be writing.
+  void gathered(std::string_view key) {
+    const uint64_t bit = uint64_t{1} << hash(key, entries()[count_++].key);
     if ((seen_ & bit) != 0) [[unlikely]]
       mergeLast();
     seen_ |= bit;
@@ -55,9 +56,8 @@ class EntryGatherer {
   DictionaryEntry* entries() { return std::launder(reinterpret_cast<DictionaryEntry*>(storage_)); }
 
   // Six bits.
-  static unsigned hash(const String& key) {
+  static unsigned hash(std::string_view text, const String& key) {
     uint64_t low = 0, high = 0;
-    const std::string_view text = key.view();
     if (text.size() >= 8) {
       std::memcpy(&low, text.data(), 8);
       std::memcpy(&high, text.data() + text.size() - 8, 8);
@@ -94,7 +94,7 @@ KYT_HOT Value basicValue(WireCursor& c, char type) {
       std::string_view view;
       if (!text(c, view)) [[unlikely]]
         return {};
-      return String(view);
+      return view;
     }
     case 'b': {
       bool v = false;
@@ -212,7 +212,7 @@ bool readEntries(WireCursor& c, std::string_view valueType, Dictionary& out, int
     std::string_view key;
     if (!align<8>(c) || !text(c, key)) return false;
     ::new (first.next()) DictionaryEntry{String(key), entryValue(c, valueType, depth + 2)};
-    first.gathered();
+    first.gathered(key);
     if (c.status != BodyStatus::ok) [[unlikely]]
       return false;
   }

@@ -232,6 +232,32 @@ TEST(Dictionary, RemovesAndChangesInOnePass) {
   EXPECT_EQ(dictionary.indexBlock(), nullptr);
 }
 
+TEST(Dictionary, GivesAwayAValueOfItsOwn) {
+  Dictionary dictionary{{"inner", Dictionary{{"a", 1}}}, {"other", 2}};
+  const void* block = dictionary.find("inner")->block();
+  const Value taken = dictionary.take("inner");
+  EXPECT_EQ(taken.block(), block);
+  EXPECT_TRUE(dictionary.find("inner")->isNull());
+  EXPECT_EQ(*dictionary.find("other"), Value(2));
+  EXPECT_TRUE(dictionary.take("missing").isNull());
+  EXPECT_TRUE(Dictionary().take("missing").isNull());
+}
+
+TEST(Dictionary, GivesACopyOfAValueThatOthersSee) {
+  Dictionary dictionary{{"inner", Dictionary{{"a", 1}}}};
+  const Dictionary shared = dictionary;
+  EXPECT_EQ(dictionary.take("inner"), Value(Dictionary{{"a", 1}}));
+  EXPECT_EQ(*shared.find("inner"), Value(Dictionary{{"a", 1}}));
+}
+
+TEST(Dictionary, AppendsAValueOfItsOwnWhenItMustGrowForIt) {
+  Dictionary dictionary{{"first", "a text that is too long to live inside a value"}};
+  for (int i = 0; i < 40; ++i) dictionary.append(keyOf(i), *dictionary.find("first"));
+  EXPECT_EQ(dictionary.size(), 41U);
+  for (const DictionaryEntry& entry : dictionary)
+    EXPECT_EQ(*entry.value.string(), "a text that is too long to live inside a value");
+}
+
 TEST(Dictionary, EqualsAnotherWhateverTheirOrder) {
   EXPECT_EQ((Dictionary{{"a", 1}, {"b", 2}}), (Dictionary{{"b", 2.0}, {"a", 1}}));
   EXPECT_FALSE((Dictionary{{"a", 1}}) == (Dictionary{{"b", 1}}));
