@@ -83,7 +83,7 @@ void KYTReportingBackend::updateState() {
   setState(kBackendStateEnabled);
 }
 
-Value KYTReportingBackend::sendMessage(const Dictionary&, const TimeValue&, uint16_t, uint16_t, EventID,
+Value KYTReportingBackend::sendMessage(Dictionary, const TimeValue&, uint16_t, uint16_t, EventID,
                                        MessageFlag) {
   return {};
 }
@@ -92,10 +92,10 @@ Value KYTReportingBackend::sendMessage(const Dictionary&, const TimeValue&, uint
   return {};
 }
 
-Value KYTReportingBackend::sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+Value KYTReportingBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                                        uint16_t respCode, MessageFlag flag) {
   ++eventID_;
-  return sendMessage(message, timestamp, method, respCode, EventID{eventID_}, flag);
+  return sendMessage(std::move(message), timestamp, method, respCode, EventID{eventID_}, flag);
 }
 
 void KYTReportingBackend::setStartTimestamp(const TimeValue& timestamp) {

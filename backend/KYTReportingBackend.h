@@ -76,14 +76,15 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   void setState(int32_t state);
   virtual void updateState();
 
-  // The operation that every event goes through. The returned text goes into the local message log.
-  virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
+  // The operation that every event goes through. The returned text goes into the local message log. The message comes by
+  // value, so that the last of several back ends may make its record of it instead of copying it.
+  virtual Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                             uint16_t respCode, EventID eventID, MessageFlag flag);
   // An operation of its own: back ends that implement only this one are not reached by routed events.
   virtual Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
                             uint16_t respCode, EventID eventID);
   // Numbers the event (1 for the first, 0 after 65535) and passes it to the six-argument operation.
-  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+  Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     MessageFlag flag);
 
   void setStartTimestamp(const TimeValue& timestamp);

@@ -119,12 +119,12 @@ class ReportingdSession final : public ClientSessionInterface,
   [[nodiscard]] bool hasBackends() const { return !_backends.empty(); }
 
   // Routing.
-  Value sendMessageWithDictionaryError(const Dictionary& message);
+  Value sendMessageWithDictionaryError(Dictionary message);
   void internalSendMessage(std::optional<Dictionary> payload, const TimeValue& timestamp, uint16_t method,
                            uint16_t respCode);
-  [[nodiscard]] Dictionary envelopeWithPayload(const Dictionary* payload);
-  Value routeToBackends(const Dictionary& envelope, const TimeValue& timestamp, uint16_t category,
-                        uint16_t type, MessageFlag flag);
+  [[nodiscard]] Dictionary envelopeWithPayload(std::optional<Dictionary> payload);
+  Value routeToBackends(Dictionary envelope, const TimeValue& timestamp, uint16_t category, uint16_t type,
+                        MessageFlag flag);
 
   // Flush and uploads.
   void internalFlushMessagesWithCompletion(ResultReply completion);

@@ -81,7 +81,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
     Dictionary message = payload.value_or(Dictionary());
     if (deviceIdentity().isInternalBuild())
       message.set("SerialNum", deviceIdentity().serialNumber().value_or("Unknown"));
-    const Value answer = backend->sendMessage(message, timestamp, category, type, MessageFlag{0});
+    const Value answer = backend->sendMessage(std::move(message), timestamp, category, type, MessageFlag{0});
     if (!answer.isNull()) messageLog_.writeToLogFile("[%@ -> sendMessageWithSessionInfo] %@", {key, answer});
   }
   for (const auto& [key, backend] : *backends) backend->cleanup();

@@ -12,11 +12,11 @@ namespace kyt {
 
 void ReportingdSession::sendMessageWithDictionary(Dictionary message, ObjectReply reply) {
   log().debug("sendMessageWithDictionary: Sending message for session %u", _sessionID);
-  Value answer = sendMessageWithDictionaryError(message);
+  Value answer = sendMessageWithDictionaryError(std::move(message));
   if (reply) reply(std::move(answer));
 }
 
-Value ReportingdSession::sendMessageWithDictionaryError(const Dictionary& message) {
+Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!hasBackends()) {
     log().debug("sendMessageWithDictionary: No backends available to send message");
     return nullptr;
@@ -35,16 +35,19 @@ Value ReportingdSession::sendMessageWithDictionaryError(const Dictionary& messag
   const auto respCode = static_cast<uint16_t>(type->unsignedIntValue());
   const Value* flag = message.find(kKYTReportingMessageParametersFlag);
   const auto messageFlag = MessageFlag{flag != nullptr ? static_cast<int32_t>(flag->unsignedIntValue()) : 0};
-  const Value* payloadValue = message.find(kKYTReportingMessageParametersPayload);
-  const Dictionary* payload = payloadValue != nullptr ? payloadValue->dictionary() : nullptr;
+  Value payloadValue = message.take(kKYTReportingMessageParametersPayload);
+  Dictionary* payload = payloadValue.mutableDictionary();
   const TimeValue timestamp = platform().clock.timeOfDay();
 
   // Every message, whatever the back ends' lists say of it.
   aggregateMessage(_sessionInfo, timestamp.asSeconds(), method, respCode, payload);
-  return routeToBackends(envelopeWithPayload(payload), timestamp, method, respCode, messageFlag);
+  std::optional<Dictionary> clientData;
+  if (payload != nullptr) clientData = std::move(*payload);
+  return routeToBackends(envelopeWithPayload(std::move(clientData)), timestamp, method, respCode,
+                         messageFlag);
 }
 
-Dictionary ReportingdSession::envelopeWithPayload(const Dictionary* payload) {
+Dictionary ReportingdSession::envelopeWithPayload(std::optional<Dictionary> payload) {
   Dictionary envelope;
   // A session without a token never has shared data, so it need not wait for the monitor to learn that.
   if (_hierarchyDictionary) {
@@ -52,14 +55,16 @@ Dictionary ReportingdSession::envelopeWithPayload(const Dictionary* payload) {
     if (std::optional<Dictionary> sharedData = _sessionDelegate.sharedDataForSession(*this))
       envelope.append(kKYTReportingMessageBlobSharedData, std::move(*sharedData));
   }
-  if (payload != nullptr) envelope.append(kKYTReportingMessageBlobClientData, *payload);
+  if (payload) envelope.append(kKYTReportingMessageBlobClientData, std::move(*payload));
   return envelope;
 }
 
-Value ReportingdSession::routeToBackends(const Dictionary& envelope, const TimeValue& timestamp,
-                                         uint16_t category, uint16_t type, MessageFlag flag) {
+Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& timestamp, uint16_t category,
+                                         uint16_t type, MessageFlag flag) {
   Value answer;
+  size_t left = _backends.size();
   for (const auto& [key, backend] : _backends) {
+    --left;
     if (!backend->isWhitelistedEvent(category)) {
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
@@ -72,7 +77,8 @@ Value ReportingdSession::routeToBackends(const Dictionary& envelope, const TimeV
           category, backend->name().c_str());
       continue;
     }
-    Value result = backend->sendMessage(envelope, timestamp, category, type, flag);
+    Value result =
+        backend->sendMessage(left == 0 ? std::move(envelope) : envelope, timestamp, category, type, flag);
     if (result.isNull()) continue;
     class_.messageLog().writeToLogFile("[%@ -> sendMessageWithDictionary] %@", {key, result});
     const String& name = backend->name();
@@ -91,7 +97,7 @@ void ReportingdSession::internalSendMessage(std::optional<Dictionary> payload, c
   if (payload) message.set(kKYTReportingMessageParametersPayload, std::move(*payload));
   message.set(kKYTReportingMessageParametersFlag, 0U);
   // Nobody waits for the answer of an internal message.
-  static_cast<void>(sendMessageWithDictionaryError(message));
+  static_cast<void>(sendMessageWithDictionaryError(std::move(message)));
   log().debug("internalSendMessage: Sent internal message (method:%d respCode:%d)", method, respCode);
 }
 

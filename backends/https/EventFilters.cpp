@@ -8,15 +8,17 @@ namespace kyt {
 
 namespace {
 
-// One bit of 64 for the length and both ends of a key, the same for keys that differ in case alone. Most keys
-// of a record are about no filter, and this is what they cost.
-uint64_t shapeBit(std::string_view key) {
-  if (key.empty()) return 1;
+// A number below kShapes for the length and both ends of a key, the same for keys that differ in case alone.
+// Most keys of a record are about no filter, and this is what they cost.
+[[gnu::always_inline]] inline size_t shapeOf(std::string_view key) {
+  if (key.empty()) return 0;
   const auto folded = [](char c) {
     const auto byte = static_cast<unsigned char>(c);
-    return byte < 0x80 ? size_t{byte} | 0x20u : size_t{0x80};  // no fold makes a character ASCII
+    return byte < 0x80 ? byte | 0x20u : 0x80u;  // no fold makes a character ASCII
   };
-  return uint64_t{1} << ((key.size() * 7 + folded(key.front()) + folded(key.back()) * 5) & 63);
+  const auto ends = static_cast<uint32_t>(key.size()) << 16 | folded(key.front()) << 8 | folded(key.back());
+  static_assert(EventFilters::kShapes == 256);
+  return (ends * 0x9E3779B1u) >> 24;
 }
 
 template <typename Matches>
@@ -74,7 +76,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   if (filters.empty()) return;
   filters_.clear();
   filters_.reserve(filters.size());
-  keyShapes_ = 0;
+  keyShapes_.reset();
   for (const Value& element : filters) {
     Filter filter;
     if (const Dictionary* dictionary = element.dictionary()) {
@@ -83,7 +85,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
       const Value* key = dictionary->find("key");
       if (key != nullptr && key->string() != nullptr) {
         filter.foldedKey = foldCase(*key->string());
-        keyShapes_ |= shapeBit(*filter.foldedKey);
+        keyShapes_.set(shapeOf(*filter.foldedKey));
       }
       const Value* action = dictionary->find("action");
       const String* name = action != nullptr ? action->string() : nullptr;
@@ -94,12 +96,11 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   }
 }
 
-EventFilters::Action EventFilters::actionForKey(std::string_view key, int32_t method, int32_t status) const {
-  if ((keyShapes_ & shapeBit(key)) == 0) return Action::keep;
+EventFilters::Action EventFilters::actionForKey(std::string_view key, const Numbers& numbers) const {
   for (const Filter& filter : filters_) {
     if (!filter.foldedKey || filter.foldedKey->size() != key.size()) continue;
-    if (filter.method >= 0 && filter.method != method) continue;
-    if (filter.status >= 0 && filter.status != status) continue;
+    if (filter.method >= 0 && filter.method != numbers.method) continue;
+    if (filter.status >= 0 && filter.status != numbers.status) continue;
     if (equalsFolded(key, *filter.foldedKey)) return filter.action;
   }
   return Action::keep;
@@ -107,11 +108,13 @@ EventFilters::Action EventFilters::actionForKey(std::string_view key, int32_t me
 
 void EventFilters::filterEvent(Dictionary& event, Digest& digest) const {
   if (filters_.empty()) return;
-  // Read before any change; a record without them counts as method 0 and status 0, deliberately.
-  const int32_t method = intEntry(event, "_method", 0);
-  const int32_t status = intEntry(event, "_status", 0);
+  // Read before any change, which none but a key of a filter's shape brings; a record without them counts as
+  // method 0 and status 0, deliberately.
+  std::optional<Numbers> numbers;
   event.removeIf([&](const String& key, Value& value) {
-    switch (actionForKey(key, method, status)) {
+    if (!keyShapes_[shapeOf(key)]) return false;
+    if (!numbers) numbers = Numbers{intEntry(event, "_method", 0), intEntry(event, "_status", 0)};
+    switch (actionForKey(key, *numbers)) {
       case Action::keep:
         return false;
       case Action::remove:

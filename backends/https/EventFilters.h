@@ -6,6 +6,8 @@
 // record of each event passes all filters.
 #pragma once
 
+#include <bitset>
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -25,6 +27,7 @@ namespace kyt {
 
 class EventFilters {
  public:
+  static constexpr size_t kShapes = 256;
   enum class Action : int32_t { keep = 0, remove = 1, sha256 = 2 };
   // The text of the digest of a text.
   using Digest = Function<String(const String&)>;
@@ -43,10 +46,13 @@ class EventFilters {
     Action action = Action::keep;
     std::optional<std::string> foldedKey;  // none: takes its place in the table and is about no key
   };
-  [[nodiscard]] Action actionForKey(std::string_view key, int32_t method, int32_t status) const;
+  struct Numbers {
+    int32_t method, status;  // of the record
+  };
+  [[nodiscard]] Action actionForKey(std::string_view key, const Numbers& numbers) const;
 
   std::vector<Filter> filters_;
-  uint64_t keyShapes_ = 0;  // the bits that the filters' keys have (EventFilters.cpp)
+  std::bitset<kShapes> keyShapes_;  // those that the filters' keys have (EventFilters.cpp)
 };
 
 }  // namespace kyt

@@ -81,11 +81,11 @@ const String* HTTPSPostBackend::userInfoText(const char* key) const {
   return value != nullptr ? value->string() : nullptr;
 }
 
-Dictionary HTTPSPostBackend::mutablePayload(const Dictionary& message) const {
-  const Value* clientData = message.find(kKYTReportingMessageBlobClientData);
+Dictionary HTTPSPostBackend::takePayload(Dictionary& message) const {
   // The single-message door sends the bare payload.
-  if (clientData == nullptr) return message;
-  if (const Dictionary* payload = clientData->dictionary()) return *payload;
+  if (!message.contains(kKYTReportingMessageBlobClientData)) return message;
+  Value clientData = message.take(kKYTReportingMessageBlobClientData);
+  if (Dictionary* payload = clientData.mutableDictionary()) return std::move(*payload);
   platform_.log.error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
   return {};
 }
@@ -99,19 +99,20 @@ void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
   payload.set("Batch", batchEvents_ ? 1u : 0u);
 }
 
-Value HTTPSPostBackend::sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method,
-                                    uint16_t respCode, EventID eventID, MessageFlag flag) {
-  const int32_t oldState = state();
+Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
+                                    uint16_t respCode, EventID, MessageFlag flag) {
+  const Shared now = stateQueue().sync([this] { return Shared{state_, combinedSessionIDString_}; });
+  const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
     platform_.counters.add(Reason::eventDroppedByState);
     return {};
   }
-  Dictionary payload = mutablePayload(message);
+  Dictionary payload = takePayload(message);
   if (isSessionStop(method, respCode)) addStopEntries(payload);
   const Value* shared = message.find(kKYTReportingMessageBlobSharedData);
   const Dictionary* frameworkData = shared != nullptr ? shared->dictionary() : nullptr;
-  Dictionary record = newEventDictfromPayload(payload, timestamp, method, respCode, eventID,
-                                              frameworkData != nullptr ? frameworkData->size() : 0);
+  Dictionary record = makeRecord(std::move(payload), timestamp, method, respCode, now.sessionID,
+                                 frameworkData != nullptr ? frameworkData->size() : 0);
   prepareEventForMessage(record, frameworkData);
   // This message is deliberately still handled with the old state: it is the last of the batch that it frees.
   if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled);

@@ -38,7 +38,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   ~HTTPSPostBackend() override;
 
   using KYTReportingBackend::sendMessage;
-  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+  Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override;
   void updateState() override;
   Value flushMessagesWithCompletion(FlushCompletion completion) override;
@@ -46,11 +46,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void setCorrelatedSessionID(const String& sessionID) override;
   [[nodiscard]] uint64_t batchedEventsSize() const override;
 
-  // The record of one event: a copy of the payload, and the fixed keys over it. `eventID` is ignored. `room`
-  // is how many more entries the caller is going to merge.
-  [[nodiscard]] Dictionary newEventDictfromPayload(const Dictionary& payload, const TimeValue& timestamp,
-                                                   uint16_t method, uint16_t respCode, EventID eventID,
-                                                   size_t room = 0) const;
+  // The record of one event: a copy of the payload, and the fixed keys over it. `eventID` is ignored.
+  [[nodiscard]] Dictionary newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
+                                                   uint16_t method, uint16_t respCode, EventID eventID) const;
   // Merges the user information, then `frameworkData` (which may be null), each over what is there, then
   // filters.
   void prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const;
@@ -90,6 +88,10 @@ class HTTPSPostBackend : public KYTReportingBackend {
 
  private:
   enum class BatchTaking { nothing, discarded, userInfoMissing, taken };
+  struct Shared {  // what other sessions may change
+    int32_t state = kBackendStateUndecided;
+    std::optional<String> sessionID;
+  };
   struct Client {  // what the user information calls the client, null where it does not
     const String* name = nullptr;
     const String* service = nullptr;
@@ -100,7 +102,11 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] const String* userInfoText(const char* key) const;
 
   // The road of one event.
-  [[nodiscard]] Dictionary mutablePayload(const Dictionary& message) const;
+  [[nodiscard]] Dictionary takePayload(Dictionary& message) const;
+  // `room` is how many more entries the caller is going to merge.
+  [[nodiscard]] Dictionary makeRecord(Dictionary payload, const TimeValue& timestamp, uint16_t method,
+                                      uint16_t respCode, const std::optional<String>& sessionID,
+                                      size_t room) const;
   void addStopEntries(Dictionary& payload) const;
   Value sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                        MessageFlag flag);

@@ -16,38 +16,29 @@ namespace kyt {
 
 namespace {
 
-constexpr size_t kInlineText = 15;     // longer texts own a block
 constexpr size_t kBlockOverhead = 32;  // header of a block, and the allocator's
-
-size_t textBytes(const String& text) {
-  return text.size() > kInlineText ? kBlockOverhead + text.size() : 0;
-}
 
 // What a record holds, roughly: for the limit of the batch, where the health report's estimate would cost a
 // query of the allocator for each block of each event.
 size_t heldBytes(const Dictionary& dictionary);
 
 size_t heldBytes(const Value& value) {
-  switch (value.kind()) {
-    case Value::Kind::string:
-      return textBytes(*value.string());
-    case Value::Kind::data:
-      return kBlockOverhead + value.data()->size();
-    case Value::Kind::dictionary:
-      return heldBytes(*value.dictionary());
-    case Value::Kind::array: {
-      size_t bytes = kBlockOverhead + value.array()->size() * sizeof(Value);
-      for (const Value& element : *value.array()) bytes += heldBytes(element);
-      return bytes;
-    }
-    default:
-      return 0;
-  }
+  if (value.block() == nullptr) return 0;  // all but long texts, data and containers
+  if (const String* text = value.string()) return kBlockOverhead + text->size();
+  if (const Data* data = value.data()) return kBlockOverhead + data->size();
+  if (const Dictionary* dictionary = value.dictionary()) return heldBytes(*dictionary);
+  const Array& array = *value.array();
+  size_t bytes = kBlockOverhead + array.size() * sizeof(Value);
+  for (const Value& element : array) bytes += heldBytes(element);
+  return bytes;
 }
 
 size_t heldBytes(const Dictionary& dictionary) {
   size_t bytes = kBlockOverhead + dictionary.size() * sizeof(DictionaryEntry);
-  for (const DictionaryEntry& entry : dictionary) bytes += textBytes(entry.key) + heldBytes(entry.value);
+  for (const DictionaryEntry& entry : dictionary) {
+    if (entry.key.block() != nullptr) bytes += kBlockOverhead + entry.key.size();
+    if (entry.value.block() != nullptr) bytes += heldBytes(entry.value);
+  }
   return bytes;
 }
 
@@ -74,7 +65,7 @@ int32_t HTTPSPostBackend::countOnQueue(int32_t method) const {
 
 void HTTPSPostBackend::appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes) {
   if (!batchedEvents_) batchedEvents_.emplace();
-  batchedEvents_->append(Value(std::move(record)));
+  batchedEvents_->append(std::move(record));
   batchedBytes_ += bytes;
   const auto place = std::lower_bound(eventMethodCounts_.begin(), eventMethodCounts_.end(),
                                       std::pair<int32_t, int32_t>{method, 0});

@@ -3,6 +3,7 @@
 #include <array>
 #include <cmath>
 #include <string_view>
+#include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "config/ClientTypes.h"
@@ -48,15 +49,16 @@ bool mayHoldFixedKey(const Dictionary& payload) {
 class RecordWriter {
  public:
   RecordWriter(Dictionary& record, bool mayReplace) : record_(record), mayReplace_(mayReplace) {}
-  void set(const String& key, Value value) {
-    if (mayReplace_) {
-      record_.set(key, std::move(value));
+  template <typename Content>
+  void set(const String& key, Content&& value) {
+    if (mayReplace_) [[unlikely]] {
+      record_.set(key, Value(std::forward<Content>(value)));
     } else {
-      record_.append(key, std::move(value));
+      record_.append(key, std::forward<Content>(value));
     }
   }
   void setWhenKnown(const String& key, const std::optional<String>& value) {
-    if (value) set(key, Value(*value));
+    if (value) set(key, *value);
   }
 
  private:
@@ -82,13 +84,18 @@ const String& HTTPSPostBackend::reportVersion() const {
   return reportVersion_;
 }
 
-Dictionary HTTPSPostBackend::newEventDictfromPayload(const Dictionary& payload, const TimeValue& timestamp,
-                                                     uint16_t method, uint16_t respCode, EventID,
-                                                     size_t room) const {
+Dictionary HTTPSPostBackend::newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
+                                                     uint16_t method, uint16_t respCode, EventID) const {
+  return makeRecord(std::move(payload), timestamp, method, respCode, combinedSessionIDString(), 0);
+}
+
+Dictionary HTTPSPostBackend::makeRecord(Dictionary payload, const TimeValue& timestamp, uint16_t method,
+                                        uint16_t respCode, const std::optional<String>& sessionID,
+                                        size_t room) const {
   const RecordKeys& keys = recordKeys();
-  Dictionary record = payload;
-  record.reserve(payload.size() + kFixedKeys + room + (userInfoDict_ ? userInfoDict_->size() : 0));
-  RecordWriter writer(record, mayHoldFixedKey(payload));
+  Dictionary record = std::move(payload);
+  RecordWriter writer(record, mayHoldFixedKey(record));
+  record.reserve(record.size() + kFixedKeys + room + (userInfoDict_ ? userInfoDict_->size() : 0));
 
   const int64_t startTS = Value(startTimeStamp_).longLongValue() / kSecondsPerMinute * kSecondsPerMinute;
   writer.set(keys.startTS, startTS);
@@ -100,7 +107,7 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(const Dictionary& payload, 
   if (numericSessionID) {
     writer.set(keys.sessionID, sessionID_);
   } else {
-    writer.setWhenKnown(keys.sessionID, combinedSessionIDString());
+    writer.setWhenKnown(keys.sessionID, sessionID);
   }
   writer.set(keys.eventNumber, static_cast<unsigned>(eventID_));
   writer.set(keys.method, static_cast<unsigned>(method));

@@ -58,7 +58,7 @@ void QDXBackend::loadAdaptor() {
   if (qdxAdaptorClass_ != nullptr) qdxAdaptor_ = qdxAdaptorClass_->newInstance();
 }
 
-Value QDXBackend::sendMessage(const Dictionary& message, const TimeValue&, uint16_t method, uint16_t respCode,
+Value QDXBackend::sendMessage(Dictionary message, const TimeValue&, uint16_t method, uint16_t respCode,
                               EventID, MessageFlag) {
   if (qdxAdaptor_ != nullptr && qdxAdaptor_->respondsTo(kForwardingOperation)) {
     qdxAdaptor_->invoke(kForwardingOperation, method, respCode, message);

@@ -24,7 +24,7 @@ class QDXBackend : public KYTReportingBackend {
   [[nodiscard]] static bool isClientTypeAllowed(int32_t clientType);
 
   using KYTReportingBackend::sendMessage;
-  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+  Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override;
 
  protected:

@@ -16,7 +16,7 @@ class RecordingBackend : public KYTReportingBackend {
  public:
   explicit RecordingBackend(Platform& platform) : KYTReportingBackend(platform, "name", {}, "Phone") {}
   using KYTReportingBackend::sendMessage;
-  Value sendMessage(const Dictionary&, const TimeValue&, uint16_t method, uint16_t, EventID eventID,
+  Value sendMessage(Dictionary, const TimeValue&, uint16_t method, uint16_t, EventID eventID,
                     MessageFlag flag) override {
     lastEventID = static_cast<uint16_t>(eventID);
     lastFlag = flag;

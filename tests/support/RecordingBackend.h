@@ -54,11 +54,11 @@ class RecordingBackend final : public KYTReportingBackend {
   }
 
   using KYTReportingBackend::sendMessage;
-  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+  Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override {
     calls.emplace_back("send");
-    sent.push_back(
-        {message, timestamp, method, respCode, static_cast<uint16_t>(eventID), static_cast<int32_t>(flag)});
+    sent.push_back({std::move(message), timestamp, method, respCode, static_cast<uint16_t>(eventID),
+                    static_cast<int32_t>(flag)});
     return answer;
   }
   Value flushMessagesWithCompletion(FlushCompletion completion) override {

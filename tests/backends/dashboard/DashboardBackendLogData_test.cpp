@@ -50,9 +50,9 @@ class RecordingDashboard final : public DashboardBackend {
     postURL_ = "https://logs.example.org";
   }
   using DashboardBackend::sendMessage;
-  Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
+  Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override {
-    messages.push_back(message);
+    messages.push_back(std::move(message));
     numbers = {timestamp.seconds, timestamp.microseconds,         method,
                respCode,          static_cast<uint16_t>(eventID), static_cast<int>(flag)};
     return {};
