@@ -272,6 +272,9 @@ class Bench {
     std::vector<Peer> ten;
     other.openSessions(ten, 10);
     if (ten.size() < 10 || peers.size() < 10) return;
+    // Client and daemons share one processor. Otherwise a round trip takes two or three times as long when the
+    // scheduler happens to put its two threads on two, and one daemon's row may be lucky where the other's is not.
+    const OneProcessor pinned({stage_->daemon()->pid(), other.stage_->daemon()->pid()});
     std::vector<double> alone, crowded;
     for (int block = 0; block < 42; ++block) {
       const bool warm = block < 2;

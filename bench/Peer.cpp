@@ -5,6 +5,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cstring>
 #include <filesystem>
@@ -135,6 +136,24 @@ ProcessFigures figuresOf(int pid) {
     }
   }
   return figures;
+}
+
+OneProcessor::OneProcessor(std::initializer_list<int> pids) {
+  CPU_ZERO(&former_);
+  sched_getaffinity(0, sizeof former_, &former_);
+  cpu_set_t one;
+  CPU_ZERO(&one);
+  CPU_SET(static_cast<size_t>(std::max(sched_getcpu(), 0)), &one);
+  sched_setaffinity(0, sizeof one, &one);
+  std::error_code error;
+  for (const int pid : pids)
+    for (const auto& task :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", error))
+      sched_setaffinity(std::stoi(task.path().filename()), sizeof one, &one);
+}
+
+OneProcessor::~OneProcessor() {
+  sched_setaffinity(0, sizeof former_, &former_);
 }
 
 }  // namespace kyt::bench

@@ -2,7 +2,10 @@
 // load costs little beside what it measures.
 #pragma once
 
+#include <sched.h>
+
 #include <cstdint>
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -41,5 +44,18 @@ struct ProcessFigures {
 };
 [[nodiscard]] ProcessFigures figuresOf(int pid);
 [[nodiscard]] double processorSeconds(int pid);
+
+// Keeps the calling thread and all threads of these processes on the processor on which the caller is now;
+// lets the calling thread go at the end, the processes not.
+class OneProcessor {
+ public:
+  explicit OneProcessor(std::initializer_list<int> pids);
+  ~OneProcessor();
+  OneProcessor(const OneProcessor&) = delete;
+  OneProcessor& operator=(const OneProcessor&) = delete;
+
+ private:
+  cpu_set_t former_;
+};
 
 }  // namespace kyt::bench
