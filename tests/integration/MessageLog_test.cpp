@@ -34,9 +34,9 @@ TEST_F(MessageLog, HasWhatWasPostedAndWhichFilesWereUploaded) {
   const Process client = open("talks", -1, 1);
   sendAndSettle(*client, 10, R"({"text":"two\nlines"})");
   flush(*client);
-  client->step(R"({"do":"send","category":11,"type":1,"flag":1,"reply":true,"payload":{}})");
-  while (client->line() != "}") {
-  }
+  const std::string reply =
+      client->ask(R"({"do":"send","category":11,"type":1,"flag":1,"reply":true,"payload":{}})");
+  EXPECT_TRUE(reply.starts_with("{\\n") && reply.ends_with("\\n}")) << reply;
   ASSERT_EQ(files().size(), 2U) << "the old one was deleted, the foreign one was not";
   EXPECT_EQ(files()[0], "crash_1.diag");
   EXPECT_EQ(contents(folder() + "/crash_1.diag"), "another's\n");
