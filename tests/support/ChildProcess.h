@@ -13,8 +13,10 @@
 
 namespace kyt {
 
-// What `work` answered there (a text, usually what went wrong), or how the process ended instead.
-inline std::string inChildProcess(const std::function<std::string()>& work) {
+// What `work` answered there (a text, usually what went wrong), or how the process ended instead. `meanwhile` runs in
+// this process once the other has begun.
+inline std::string inChildProcess(const std::function<std::string()>& work,
+                                  const std::function<void()>& meanwhile = {}) {
   int ends[2];
   if (::pipe(ends) != 0) return "pipe failed";
   const pid_t child = ::fork();
@@ -28,6 +30,7 @@ inline std::string inChildProcess(const std::function<std::string()>& work) {
     ::_exit(written ? 0 : 99);
   }
   ::close(ends[1]);
+  if (meanwhile) meanwhile();
   std::string text;
   char buffer[4096];
   for (ssize_t count = 0; (count = ::read(ends[0], buffer, sizeof buffer)) != 0;) {

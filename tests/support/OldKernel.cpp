@@ -16,7 +16,6 @@
 namespace kyt {
 namespace {
 
-constexpr int64_t kVersion = 2;
 constexpr uint64_t kKnownRights = (1ULL << 14) - 1;  // reading to REFER
 constexpr int kPeerProcess = 77;                     // SO_PEERPIDFD
 
@@ -115,7 +114,7 @@ void OldKernel::answer(int listener) {
   if (seccomp_notify_receive(listener, question) == 0) {
     reply->id = question->id;
     if (question->data.args[2] == LANDLOCK_CREATE_RULESET_VERSION) {
-      reply->val = kVersion;
+      reply->val = kLandlock;
       askedForVersion_ = true;
     } else if (isKnown(*question)) {
       reply->flags = SECCOMP_USER_NOTIF_FLAG_CONTINUE;

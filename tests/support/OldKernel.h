@@ -10,6 +10,8 @@ namespace kyt {
 
 class OldKernel {
  public:
+  static constexpr int kLandlock = 2;  // its version
+
   OldKernel();
   ~OldKernel();  // ends the thread that answers; the process must have ended, or need no answer any more
   OldKernel(const OldKernel&) = delete;

@@ -8,6 +8,7 @@
 #include <netinet/in.h>
 #include <sched.h>
 #include <signal.h>
+#include <stddef.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/ioctl.h>
@@ -41,6 +42,13 @@ static int opening(const char* root, const char* path, int flags) {
   char whole[1024];
   snprintf(whole, sizeof whole, "%s/%s", root, path);
   return descriptor(open(whole, flags | O_CLOEXEC, 0600));
+}
+
+static int connecting(const void* address, socklen_t size, int family, int type) {
+  const int made = socket(family, type | SOCK_CLOEXEC, 0);
+  const int error = result(connect(made, address, size));
+  close(made);
+  return error;
 }
 
 static const char* in(const char* root, const char* path) {
@@ -78,11 +86,35 @@ ATTEMPT(cutTheSettings) {
 ATTEMPT(removeTheSettings) {
   return result(unlink(in(root, SETTINGS)));
 }
+ATTEMPT(replaceTheSettings) {
+  char made[1024];
+  snprintf(made, sizeof made, "%s/" STATE "/settings", root);
+  close(open(made, O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+  const int error = result(rename(made, in(root, SETTINGS)));
+  unlink(made);
+  return error;
+}
+ATTEMPT(takeTheSettings) {
+  char into[1024];
+  snprintf(into, sizeof into, "%s/" STATE "/settings", root);
+  return result(rename(in(root, SETTINGS), into));
+}
+ATTEMPT(linkTheSettings) {
+  char into[1024];
+  snprintf(into, sizeof into, "%s/" STATE "/settings", root);
+  return result(link(in(root, SETTINGS), into));
+}
+ATTEMPT(ownTheSettings) {
+  return result(chown(in(root, SETTINGS), 1, 1));
+}
 ATTEMPT(openTheSettingsToAll) {
   return result(chmod(in(root, SETTINGS), 0666));
 }
 ATTEMPT(makeAFolder) {
   return result(mkdir(in(root, STATE "/folder"), 0700));
+}
+ATTEMPT(removeAFolder) {
+  return result(unlinkat(AT_FDCWD, in(root, STATE), AT_REMOVEDIR));
 }
 ATTEMPT(makeASymbolicLink) {
   return result(symlink("/etc", in(root, STATE "/link")));
@@ -97,6 +129,9 @@ ATTEMPT(makeASocketElsewhere) {
   const int error = result(bind(made, (const struct sockaddr*)&address, sizeof address));
   close(made);
   return error;
+}
+ATTEMPT(openADevice) {
+  return opening("/dev", "full", O_RDWR);
 }
 ATTEMPT(openAFileByItsHandle) {
   return result(syscall(SYS_open_by_handle_at, AT_FDCWD, "\10\0\0\0\1\0\0\0abcdefgh", O_RDONLY));
@@ -141,6 +176,22 @@ ATTEMPT(mapAFileAsWritableCode) {
   close(file);
   return error;
 }
+ATTEMPT(mapALibraryElsewhere) {
+  const int file = open(in(root, "outside/file"), O_RDONLY | O_CLOEXEC);
+  const int error =
+      file < 0 ? errno : result((long)mmap(NULL, 4096, PROT_READ | PROT_EXEC, MAP_PRIVATE, file, 0));
+  close(file);
+  return error;
+}
+ATTEMPT(writeItsCodeByItsFile) {
+  return descriptor(open("/proc/self/mem", O_RDWR | O_CLOEXEC));
+}
+ATTEMPT(makeMemoryExecutableByAKey) {
+  void* const page = mmap(NULL, 4096, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  const int error = result(syscall(SYS_pkey_mprotect, page, 4096, PROT_READ | PROT_EXEC, -1));
+  munmap(page, 4096);
+  return error;
+}
 ATTEMPT(makeMemoryExecutable) {
   void* const page = mmap(NULL, 4096, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
   const int error = result(mprotect(page, 4096, PROT_READ | PROT_EXEC));
@@ -162,10 +213,19 @@ ATTEMPT(writeAProcessesMemory) {
   const struct iovec mine = {&byte, 1}, theirs = {(void*)&kAttemptCount, 1};
   return result(process_vm_writev(getppid(), &mine, 1, &theirs, 1, 0));
 }
-ATTEMPT(openAProcessesMemory) {
+static int openingOfParent(const char* file, int flags) {
   char path[64];
-  snprintf(path, sizeof path, "/proc/%d/mem", (int)getppid());
-  return descriptor(open(path, O_RDWR | O_CLOEXEC));
+  snprintf(path, sizeof path, "/proc/%d/%s", (int)getppid(), file);
+  return descriptor(open(path, flags | O_CLOEXEC));
+}
+ATTEMPT(openAProcessesMemory) {
+  return openingOfParent("mem", O_RDWR);
+}
+ATTEMPT(openAProcessesMemoryToRead) {
+  return openingOfParent("mem", O_RDONLY);
+}
+ATTEMPT(openAProcessesFiles) {
+  return openingOfParent("fd/0", O_RDONLY);
 }
 ATTEMPT(signalAProcess) {
   return result(kill(getppid(), 0));
@@ -193,7 +253,7 @@ ATTEMPT(takeADescriptorOfAnother) {
 }
 ATTEMPT(limitAnother) {
   const struct rlimit none = {0, 0};
-  return result(prlimit(getppid(), RLIMIT_NOFILE, &none, NULL));
+  return result(prlimit(getppid(), RLIMIT_CORE, &none, NULL));
 }
 
 /* the kernel */
@@ -233,7 +293,7 @@ ATTEMPT(addASystemCallFilter) {
 
 /* another view */
 ATTEMPT(mountAFolder) {
-  return result(mount("/", in(root, STATE), NULL, MS_BIND, NULL));
+  return result(mount("none", in(root, "no/such/folder"), "tmpfs", 0, NULL));
 }
 ATTEMPT(mountInTheNewWay) {
   return result(syscall(SYS_open_tree, AT_FDCWD, "/", 0));
@@ -242,7 +302,7 @@ ATTEMPT(changeAMount) {
   return result(syscall(SYS_mount_setattr, AT_FDCWD, "/", 0, NULL, 0));
 }
 ATTEMPT(unmountAFolder) {
-  return result(umount2("/proc", MNT_DETACH));
+  return result(umount2(in(root, "no/such/folder"), MNT_DETACH));
 }
 ATTEMPT(changeTheRoot) {
   return result(chroot(root));
@@ -271,8 +331,10 @@ ATTEMPT(takeCapabilities) {
   return result(syscall(SYS_capset, NULL, NULL));
 }
 ATTEMPT(raiseALimit) {
-  const struct rlimit none = {RLIM_INFINITY, RLIM_INFINITY};
-  return result(setrlimit(RLIMIT_CORE, &none));
+  struct rlimit limit;
+  getrlimit(RLIMIT_STACK, &limit);
+  limit.rlim_cur = limit.rlim_max;
+  return result(setrlimit(RLIMIT_STACK, &limit));
 }
 ATTEMPT(becomeDumpable) {
   return result(prctl(PR_SET_DUMPABLE, 1, 0, 0, 0));
@@ -315,17 +377,48 @@ ATTEMPT(listenForTCP) {
   close(made);
   return error;
 }
+ATTEMPT(bindATCPPort) {
+  const struct sockaddr_in any = {.sin_family = AF_INET};
+  const int made = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const int error = result(bind(made, (const struct sockaddr*)&any, sizeof any));
+  close(made);
+  return error;
+}
+static socklen_t abstractAddress(const char* root, struct sockaddr_un* address) {
+  memset(address, 0, sizeof *address);
+  address->sun_family = AF_UNIX;
+  const int length = snprintf(address->sun_path + 1, sizeof address->sun_path - 1, "kyt-attempt%s", root);
+  return (socklen_t)(offsetof(struct sockaddr_un, sun_path) + 1 + (size_t)length);
+}
+int openAbstractSocketForAttempts(const char* root) {
+  struct sockaddr_un address;
+  const socklen_t size = abstractAddress(root, &address);
+  const int made = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (bind(made, (const struct sockaddr*)&address, size) == 0 && listen(made, 64) == 0) return made;
+  close(made);
+  return -1;
+}
+ATTEMPT(connectToAnAbstractSocket) {
+  struct sockaddr_un address;
+  const socklen_t size = abstractAddress(root, &address);
+  return connecting(&address, size, AF_UNIX, SOCK_STREAM);
+}
+ATTEMPT(openASocketOfPackets) {
+  return socketOf(AF_UNIX, SOCK_SEQPACKET, 0);
+}
 ATTEMPT(filterASocket) {
   return result(setsockopt(0, SOL_SOCKET, SO_ATTACH_FILTER, "", 1));
 }
 ATTEMPT(typeIntoTheTerminal) {
-  return result(ioctl(0, TIOCSTI, "x"));
+  return result(ioctl(0, TIOCSTI, NULL));
 }
 
 #define ENDS(name) \
-  { #name, name, kAttemptEndsTheProcess }
+  { #name, name, kAttemptEndsTheProcess, 0 }
 #define FAILS(name, error) \
-  { #name, name, error }
+  { #name, name, error, 0 }
+#define FAILS_SINCE(name, error, landlock) \
+  { #name, name, error, landlock }
 const struct Attempt kAttempts[] = {
     FAILS(readAFileElsewhere, EACCES),
     FAILS(listAFolderElsewhere, EACCES),
@@ -335,11 +428,17 @@ const struct Attempt kAttempts[] = {
     FAILS(cutTheSettingsByOpening, EPERM),
     FAILS(cutTheSettings, EPERM),
     FAILS(removeTheSettings, EACCES),
+    FAILS(replaceTheSettings, EACCES),
+    FAILS(takeTheSettings, EACCES),
+    FAILS(linkTheSettings, EPERM),
+    FAILS(ownTheSettings, EPERM),
     FAILS(openTheSettingsToAll, EPERM),
     FAILS(makeAFolder, EACCES),
+    FAILS(removeAFolder, EACCES),
     FAILS(makeASymbolicLink, EPERM),
     FAILS(makeADevice, EPERM),
     FAILS(makeASocketElsewhere, EACCES),
+    FAILS(openADevice, EACCES),
     ENDS(openAFileByItsHandle),
     FAILS(setAKernelParameter, EACCES),
     ENDS(executeAProgram),
@@ -350,11 +449,16 @@ const struct Attempt kAttempts[] = {
     FAILS(mapWritableCode, EPERM),
     FAILS(mapCodeOfNoFile, EPERM),
     FAILS(mapAFileAsWritableCode, EPERM),
+    FAILS(mapALibraryElsewhere, EACCES),
+    FAILS(writeItsCodeByItsFile, EACCES),
     FAILS(makeMemoryExecutable, EPERM),
+    FAILS(makeMemoryExecutableByAKey, EPERM),
     ENDS(traceAProcess),
     ENDS(readAProcessesMemory),
     ENDS(writeAProcessesMemory),
     FAILS(openAProcessesMemory, EACCES),
+    FAILS(openAProcessesMemoryToRead, EACCES),
+    FAILS(openAProcessesFiles, EACCES),
     FAILS(signalAProcess, EPERM),
     FAILS(signalAllProcesses, EPERM),
     FAILS(signalAThread, EPERM),
@@ -398,6 +502,9 @@ const struct Attempt kAttempts[] = {
     FAILS(openANetfilterSocket, EPERM),
     FAILS(openAnAuditSocket, EPERM),
     FAILS(listenForTCP, EPERM),
+    FAILS_SINCE(bindATCPPort, EACCES, 4),
+    FAILS_SINCE(connectToAnAbstractSocket, EPERM, 6),
+    FAILS(openASocketOfPackets, EPERM),
     FAILS(filterASocket, EPERM),
     FAILS(typeIntoTheTerminal, EPERM),
 };
