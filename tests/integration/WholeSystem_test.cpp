@@ -15,6 +15,7 @@ TEST_F(WholeSystem, ShowsItselfInTheDemonstration) {
                                               {"--programs", KYT_PROGRAMS, "--share", KYT_SHARE, "--once"});
   EXPECT_EQ(demonstration.status, 0) << demonstration.text;
   EXPECT_NE(demonstration.text.find("ok     nothing else arrived: 20 events in all"), std::string::npos);
+  EXPECT_NE(demonstration.text.find("ok     the daemon is confined"), std::string::npos);
   if (geteuid() != 0) return;
   EXPECT_NE(demonstration.text.find("ok     the daemon runs as its own user, without capabilities"),
             std::string::npos)

@@ -98,6 +98,23 @@ TEST(ManualOfKytctl, NamesEachCommandWithItsOptions) {
   }
 }
 
+TEST(ManualOfKytctl, ShowsEachCommandInItsSynopsis) {
+  Names shown, commands;
+  for (const std::string& line : linesOf(sectionOf("kytctl.1", "SYNOPSIS"))) {
+    std::smatch match;
+    if (!std::regex_match(line, match, std::regex("\\.Cm ([a-z]+)((?: \\|| [a-z]+)*)"))) continue;
+    const Names leaves = matchesIn(match[2], "([a-z]+)");
+    for (const std::string& leaf : leaves) shown.insert(match[1].str() + " " + leaf);
+    if (leaves.empty()) shown.insert(match[1].str());
+  }
+  for (const std::string& group : helpOf("kytctl").commands) {
+    const Help help = helpOf("kytctl", {group});
+    for (const std::string& command : help.commands) commands.insert(group + " " + command);
+    if (help.commands.empty()) commands.insert(group);
+  }
+  EXPECT_EQ(shown, commands);
+}
+
 TEST(ManualOfKytctl, NamesEachStepOfAScriptedSession) {
   const std::string source = textOf("tools/kytctl/SessionCommands.cpp");
   const Names steps = matchesIn(source, "\\{\"([A-Za-z]+)\", &Script::");

@@ -62,6 +62,12 @@ Check checkUser(Stage& stage) {
           ids + "; groups " + groups + "; capabilities " + capabilities + "; NoNewPrivs " + closed};
 }
 
+Check checkConfined(Stage& stage) {
+  const std::string closed = processStatus(stage, "NoNewPrivs"), filter = processStatus(stage, "Seccomp");
+  return {"the daemon is confined: it can gain no privileges, and its system calls are filtered",
+          closed == "1" && filter == "2", "NoNewPrivs " + closed + "; Seccomp " + filter};
+}
+
 void waitForInterrupt() {
   sigset_t set;
   sigemptyset(&set);
@@ -90,6 +96,7 @@ int demonstrate(Stage& stage, bool once) {
 
   int wrong = 0;
   std::vector<Check> checks = checkArrivals(stage);
+  checks.push_back(checkConfined(stage));
   if (stage.daemonUser()) checks.push_back(checkUser(stage));
   for (const Check& check : checks) {
     std::printf("%s  %s%s%s\n", check.holds ? "ok   " : "WRONG", check.what.c_str(), check.holds ? "" : ": ",
