@@ -10,6 +10,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <string>
+#include <utility>
 
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/system/LinuxConfinement.h"
@@ -146,6 +147,45 @@ TEST_F(DaemonOnAnOldKernel, StartsAndSaysWhatItCannotEnforce) {
   EXPECT_EQ(kernel_.refusedRulesets(), 0) << "rights that such a kernel does not know";
   daemon_.terminate();
   EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+}
+
+TEST_F(DaemonOnAnOldKernel, ServesClientsAndMatchesNoProgram) {
+  const auto grant = [this](const std::string& criterion) {
+    daemon_.root().write("etc/kytreportingd/entitlements.d/test.toml",
+                         "[[grant]]\n" + criterion + "\n\"com.vantu.private.kytreportingd\" = true\n");
+  };
+  grant("executable = \"" + std::filesystem::read_symlink("/proc/self/exe").string() + "\"");
+  daemon_.setBeforeExecution([this] { kernel_.installHere(); });
+  daemon_.start();
+  kernel_.serve();
+  ASSERT_TRUE(eventually([this] { return daemon_.logged("start loop."); })) << daemon_.log();
+  TestClient refused(daemon_.socketPath(), 5);
+  refused->startConfiguration([](const auto&, const auto&) {});
+  EXPECT_TRUE(eventually([this] {
+    return daemon_.logged("does not have required kytreporting entitlement");
+  })) << daemon_.log();
+  EXPECT_TRUE(daemon_.logged(
+      "<3>entitlements: Grants by executable cannot match: the kernel does not tell which process is "
+      "connected\n"))
+      << daemon_.log();
+  refused.close();
+  grant("user = " + std::to_string(::geteuid()));
+  EXPECT_EQ(TestClient(daemon_.socketPath(), 5).configure(), "none") << daemon_.log();
+  daemon_.terminate();
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+}
+
+TEST_F(DaemonOnAnOldKernel, DoesNotRunOnOneThatCannotConfineIt) {
+  const std::pair<void (*)(), const char*> kernels[] = {
+      {takeLandlockAwayHere, "the kernel has no Landlock: Function not implemented"},
+      {takeSeccompAwayHere, "seccomp: "}};
+  for (const auto& [takeAway, why] : kernels) {
+    daemon_.setBeforeExecution(takeAway);
+    daemon_.start();
+    EXPECT_EQ(daemon_.exitStatus(), 255) << daemon_.log();
+    EXPECT_TRUE(daemon_.logged(std::string("<3>main: confine_init() fails: ") + why)) << daemon_.log();
+    EXPECT_FALSE(std::filesystem::exists(daemon_.socketPath()));
+  }
 }
 
 TEST_F(DaemonOnAnOldKernel, IsSilentOnOneThatCanAll) {

@@ -1,6 +1,7 @@
 // The daemon as a process: how it starts, serves real clients, and ends.
 #include <gtest/gtest.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <atomic>
@@ -128,6 +129,15 @@ TEST_F(Daemon, AWrongSettingIsAStartUpErrorWithItsLine) {
   daemon_.start();
   EXPECT_EQ(daemon_.exitStatus(), 1);
   EXPECT_TRUE(daemon_.logged("kytreportingd.toml:2: ")) << daemon_.log();
+}
+
+TEST_F(Daemon, DoesNotStartWithSettingsThatOthersCanWrite) {
+  ::chmod((daemon_.root() / "etc/kytreportingd/kytreportingd.toml").c_str(), 0666);
+  daemon_.start();
+  EXPECT_EQ(daemon_.exitStatus(), 1);
+  EXPECT_TRUE(
+      daemon_.logged("kytreportingd.toml: others than root and the daemon's user can write the file\n"))
+      << daemon_.log();
 }
 
 TEST_F(Daemon, IsNotConfinedWithoutAProfileAndSoDoesNotRun) {

@@ -4,6 +4,7 @@
 #include <linux/landlock.h>
 #include <poll.h>
 #include <seccomp.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
 #include <unistd.h>
@@ -125,6 +126,23 @@ void OldKernel::answer(int listener) {
     (void)seccomp_notify_respond(listener, reply);
   }
   seccomp_notify_free(question, reply);
+}
+
+void takeLandlockAwayHere() {
+  const scmp_filter_ctx filter = seccomp_init(SCMP_ACT_ALLOW);
+  for (const int call :
+       {SCMP_SYS(landlock_create_ruleset), SCMP_SYS(landlock_add_rule), SCMP_SYS(landlock_restrict_self)})
+    if (seccomp_rule_add(filter, SCMP_ACT_ERRNO(ENOSYS), call, 0) != 0) ::_exit(126);
+  if (seccomp_load(filter) != 0) ::_exit(126);
+}
+
+void takeSeccompAwayHere() {
+  const scmp_filter_ctx filter = seccomp_init(SCMP_ACT_ALLOW);
+  const scmp_arg_cmp inTheOldWay[] = {{0, SCMP_CMP_EQ, PR_SET_SECCOMP, 0}};
+  if (seccomp_rule_add(filter, SCMP_ACT_ERRNO(ENOSYS), SCMP_SYS(seccomp), 0) != 0 ||
+      seccomp_rule_add_array(filter, SCMP_ACT_ERRNO(EINVAL), SCMP_SYS(prctl), 1, inTheOldWay) != 0 ||
+      seccomp_load(filter) != 0)
+    ::_exit(126);
 }
 
 }  // namespace kyt

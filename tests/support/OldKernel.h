@@ -33,4 +33,8 @@ class OldKernel {
   std::thread thread_;
 };
 
+// In the child, before it executes the program: from then on the kernel is one without Landlock, or without seccomp.
+void takeLandlockAwayHere();
+void takeSeccompAwayHere();
+
 }  // namespace kyt

@@ -1,5 +1,5 @@
 // The filter of system calls that the kernel applies to a confined process (seccomp), made with libseccomp:
-// the one seam to that library. Used by LinuxConfinement and by the small helper processes.
+// the one seam to that library. Used by LinuxConfinement.
 //
 // The profile becomes two or three filters, since the kernel's record of refusals is switched for a whole
 // filter. The first holds the lists and leaves a record of each refusal. The second answers calls of which

@@ -1,7 +1,12 @@
 #include "platform/linux/system/TomlSettings.h"
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <limits>
 #include <utility>
+
+#include "platform/linux/system/Files.h"
 
 namespace kyt {
 namespace {
@@ -153,9 +158,13 @@ std::vector<std::string> settingNames() {
 }
 
 std::variant<Settings, TomlError> readSettings(const std::string& path) {
-  auto text = readTomlText(path);
-  if (auto* error = std::get_if<TomlError>(&text)) return std::move(*error);
-  return parseSettings(std::get<std::string>(text), path);
+  auto contents = readRegularFile(path, kMaxTomlBytes);
+  if (const auto* error = std::get_if<std::string>(&contents)) return tomlError(path, 0, *error);
+  const auto& file = std::get<FileContents>(contents);
+  const bool trustedOwner = file.identity.owner == 0 || file.identity.owner == ::geteuid();
+  if (!trustedOwner || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0)
+    return tomlError(path, 0, "others than root and the daemon's user can write the file");
+  return parseSettings(file.bytes, path);
 }
 
 }  // namespace kyt

@@ -1,5 +1,6 @@
 // kytreportingd.toml. Everything is checked: an unknown section or key, a wrong type or a number out of range
-// is an error with file and line, since a setting that is silently ignored is found out too late.
+// is an error with file and line, since a setting that is silently ignored is found out too late. So is a file that
+// others than root and this process's user can write: it says where events go, and whom to trust.
 #pragma once
 
 #include <string>

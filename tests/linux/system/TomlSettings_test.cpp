@@ -1,6 +1,8 @@
 #include "platform/linux/system/TomlSettings.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cctype>
 
@@ -185,6 +187,27 @@ TEST(TomlSettings, FilesThatCannotBeReadAreErrors) {
             (folder / "big.toml") + ": is too large");
   const auto good = readSettings(folder.write("good.toml", kHosts));
   EXPECT_TRUE(std::holds_alternative<Settings>(good));
+}
+
+TEST(TomlSettings, AFileThatOthersCanWriteIsAnError) {
+  const TemporaryFolder folder;
+  const std::string file = folder.write("settings.toml", kHosts);
+  const auto isRefused = [&file] {
+    const auto read = readSettings(file);
+    const auto* error = std::get_if<TomlError>(&read);
+    if (error == nullptr) return false;
+    EXPECT_EQ(error->text, file + ": others than root and the daemon's user can write the file");
+    return true;
+  };
+  for (const mode_t mode : {0664, 0646, 0666}) {
+    ASSERT_EQ(::chmod(file.c_str(), mode), 0);
+    EXPECT_TRUE(isRefused());
+  }
+  ASSERT_EQ(::chmod(file.c_str(), 0640), 0);
+  EXPECT_FALSE(isRefused());
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  ASSERT_EQ(::chown(file.c_str(), 1234, 0), 0);
+  EXPECT_TRUE(isRefused());
 }
 
 }  // namespace
