@@ -106,9 +106,9 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
       case ServerContext::Admission::admitted:
         break;
       case ServerContext::Admission::tooMany:
-        return refuse(Reason::tooManyConnections, user);
+        return refuse(std::move(stream), Reason::tooManyConnections, user);
       case ServerContext::Admission::tooManyOfUser:
-        return refuse(Reason::tooManyConnectionsOfUser, user);
+        return refuse(std::move(stream), Reason::tooManyConnectionsOfUser, user);
     }
     const uint64_t number = ++lastNumber_;
     const auto connection =
@@ -117,7 +117,10 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     connection->offer(listener_, *delegate_);
   }
 
-  void refuse(Reason reason, uint32_t user) {
+  // Closed by a worker of its user's: descriptors that were sent already can hold up who closes them.
+  void refuse(std::unique_ptr<Stream> stream, Reason reason, uint32_t user) {
+    SerialQueue::create("kyt.refused", context_->services.executor, uint64_t{user} + 1)
+        ->async([refused = std::move(stream)]() mutable { refused.reset(); });
     if (context_->services.counters.addAndMayLog(reason, context_->services.clock.monotonic())) {
       context_->services.log.normal("DBusServer(accept): connection of user %u refused: %s", user,
                                     reasonName(reason));

@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "platform/Limits.h"
+#include "platform/WorkerPool.h"
 #include "platform/linux/base/Descriptors.h"
 
 #ifndef SO_PEERPIDFD
@@ -51,6 +52,15 @@ bool fillAddress(const std::string& path, sockaddr_un& address) {
   if (path.empty() || path.size() >= sizeof address.sun_path) return false;
   std::memcpy(address.sun_path, path.data(), path.size());
   return true;
+}
+
+// What another process made may wait at its last close for as long as that process likes: a TCP socket that lingers, a
+// file whose file system never answers. So may a connection's own socket, in which such descriptors still lie.
+Descriptor ownDescriptorOfPeer(int descriptor) {
+  return {descriptor, [](int closed) {
+            const BlockingScope blocking;
+            closeDescriptor(closed);
+          }};
 }
 
 // Whether somebody listens there. Anything but "refused" and "no such file" counts as somebody.
@@ -93,7 +103,7 @@ StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descripto
     for (size_t at = 0; at + sizeof(int) <= bytes; at += sizeof(int)) {
       int received = -1;
       std::memcpy(&received, CMSG_DATA(header) + at, sizeof received);
-      descriptors.push_back(ownDescriptor(received));
+      descriptors.push_back(ownDescriptorOfPeer(received));
     }
   }
   if ((message.msg_flags & MSG_CTRUNC) != 0) return {StreamStatus::truncated, 0};
@@ -210,7 +220,8 @@ UnixSocketAcceptor::~UnixSocketAcceptor() {
 }
 
 AcceptStatus UnixSocketAcceptor::accept(std::unique_ptr<Stream>& stream) {
-  Descriptor socket = ownDescriptor(::accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
+  Descriptor socket =
+      ownDescriptorOfPeer(::accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
   if (socket.get() >= 0) {
     stream = std::make_unique<UnixStream>(std::move(socket));
     return AcceptStatus::accepted;
