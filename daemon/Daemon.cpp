@@ -1,5 +1,6 @@
 #include "daemon/Daemon.h"
 
+#include <cstdlib>
 #include <memory>
 #include <utility>
 #include <variant>
@@ -126,7 +127,7 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
     log.normal("main: Ending on signal %d", signal);
   else
     log.normal("main: Ending, idle for %g seconds", settings.limits.idleExitSeconds);
-  services.shutDown();
+  if (!services.shutDown()) std::_Exit(0);  // threads that do not end use all that would be destroyed here
   return 0;
 }
 

@@ -146,7 +146,7 @@ bool DaemonServices::isIdle() {
   return true;
 }
 
-void DaemonServices::shutDown() {
+bool DaemonServices::shutDown() {
   const Deadline deadline(clock_, settings_.limits.shutdownGraceSeconds);
   listener_.stopAccepting();
   // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
@@ -156,9 +156,14 @@ void DaemonServices::shutDown() {
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
     listener_.invalidateConnections();
-  workers_.shutDown();
-  reactor_->stop();
+  // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes.
+  const bool threadsEnd = workers_.shutDownWithin(deadline.left() + kCancelGrace);
+  if (threadsEnd)
+    reactor_->stop();
+  else
+    log_.error("shutDown: Threads still wait for what clients passed, ending without them");
   logFigures();
+  return threadsEnd;
 }
 
 void DaemonServices::endSessions(const Deadline& deadline) {

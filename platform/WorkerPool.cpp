@@ -55,7 +55,7 @@ class WorkerPool::Implementation {
   }
 
   void submit(std::shared_ptr<SerialQueue> queue);
-  void shutDown();
+  bool shutDown(MonotonicTime end);
   void block();
   void unblock();
   [[nodiscard]] bool borrow();
@@ -306,7 +306,7 @@ void WorkerPool::Implementation::giveBack() {
   if (--borrowed_ == 0 && stopping_) allEnded_.notifyAll();
 }
 
-void WorkerPool::Implementation::shutDown() {
+bool WorkerPool::Implementation::shutDown(MonotonicTime end) {
   std::vector<Worker*> sleepers;
   {
     MutexLock lock(mutex_);
@@ -321,7 +321,12 @@ void WorkerPool::Implementation::shutDown() {
   Queues pending;
   {
     MutexLock lock(mutex_);
-    while (workers_ > 0 || borrowed_ > 0) allEnded_.wait(mutex_);
+    while (workers_ > 0 || borrowed_ > 0) {
+      if (end == MonotonicTime::max())
+        allEnded_.wait(mutex_);
+      else if (!allEnded_.waitUntil(mutex_, end) && (workers_ > 0 || borrowed_ > 0))
+        return false;
+    }
     last = std::move(ended_);
     pending.swap(ready_);
     for (auto& [owner, queues] : parked_)
@@ -331,6 +336,7 @@ void WorkerPool::Implementation::shutDown() {
   }
   if (last.joinable()) last.join();  // it has joined the one that ended before it, and so on
   for (const std::shared_ptr<SerialQueue>& queue : pending) queue->discardPending();
+  return true;
 }
 
 WorkerPoolFigures WorkerPool::Implementation::figures() {
@@ -361,7 +367,10 @@ void WorkerPool::giveBack() {
   implementation_->giveBack();
 }
 void WorkerPool::shutDown() {
-  implementation_->shutDown();
+  static_cast<void>(implementation_->shutDown(MonotonicTime::max()));
+}
+bool WorkerPool::shutDownWithin(Duration patience) {
+  return implementation_->shutDown(std::chrono::steady_clock::now() + patience);
 }
 WorkerPoolFigures WorkerPool::figures() const {
   return implementation_->figures();

@@ -48,6 +48,8 @@ class WorkerPool final : public Executor {
   // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a
   // worker.
   void shutDown();
+  // The same, but waits so long at most: false when some are still at it. Then neither pool nor what they use may end.
+  [[nodiscard]] bool shutDownWithin(Duration patience);
   [[nodiscard]] WorkerPoolFigures figures() const;
 
  private:

@@ -60,6 +60,7 @@ class SlowCloses : public ::testing::Test {
  protected:
   void TearDown() override {
     sockets_.clear();
+    if (daemon_.process() == 0) return;  // a test has seen its end
     daemon_.terminate();
     EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   }
@@ -69,10 +70,16 @@ class SlowCloses : public ::testing::Test {
         "etc/kytreportingd/entitlements.d/test.toml",
         "[[grant]]\nuser = " + std::to_string(user) + "\n\"com.vantu.private.kytreportingd\" = true\n");
   }
+  // It stands still when this returns.
+  void stop() {
+    daemon_.terminate(SIGSTOP);
+    siginfo_t state = {};
+    EXPECT_EQ(::waitid(P_PID, static_cast<id_t>(daemon_.process()), &state, WSTOPPED), 0);
+  }
   // Clients that pass such a socket before the daemon looks at any of them.
   std::vector<std::unique_ptr<PlainClient>> connectUnseen(int count) {
     std::vector<std::unique_ptr<PlainClient>> clients;
-    daemon_.terminate(SIGSTOP);
+    stop();
     for (int i = 0; i < count; ++i) {
       clients.push_back(std::make_unique<PlainClient>(daemon_.socketPath()));
       LingeringSocket& socket = lingering();
@@ -100,7 +107,7 @@ TEST_F(SlowCloses, OfWhatClientsPassedHoldUpNoOtherClient) {
     clients.push_back(std::make_unique<PlainClient>(daemon_.socketPath()));
     ASSERT_TRUE(clients.back()->shakeHands()) << i;
   }
-  daemon_.terminate(SIGSTOP);
+  stop();
   for (const auto& client : clients) {
     LingeringSocket& socket = lingering();
     client->call("FetchDisplayURL", "", [](MessageWriter&) {}, true, {socket.get()});
@@ -129,6 +136,16 @@ TEST_F(SlowCloses, OfWhatClientsPastTheLimitPassedHoldUpNoOtherClient) {
     for (const auto& client : refused) EXPECT_TRUE(client->atEnd());
   }
   EXPECT_TRUE(eventually([&] { return PlainClient(daemon_.socketPath()).shakeHands(); })) << daemon_.log();
+}
+
+TEST_F(SlowCloses, DoNotHoldUpTheDaemonsEnd) {
+  daemon_.addSettings("shutdown_grace_seconds = 0.5\n");
+  ASSERT_TRUE(daemon_.startAndWait()) << daemon_.log();
+  const auto clients = connectUnseen(kMany);
+  expectService();
+  daemon_.terminate();
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  EXPECT_TRUE(daemon_.logged("<3>shutDown: Threads still wait for what clients passed, ending without them"));
 }
 
 }  // namespace

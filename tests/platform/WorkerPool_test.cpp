@@ -256,6 +256,21 @@ TEST(WorkerPool, LetsOneOwnerHoldHalfOfItsWorkersAndOthersPass) {
   pool.shutDown();
 }
 
+TEST(WorkerPool, TellsWhenWorkHasNotEndedInTime) {
+  WorkerPool pool(options(1));
+  Semaphore begun, release;
+  auto queue = SerialQueue::create("slow", pool);
+  queue->async([&] {
+    begun.signal();
+    release.wait();
+  });
+  ASSERT_TRUE(begun.waitFor(kDeadline));
+  EXPECT_FALSE(pool.shutDownWithin(std::chrono::milliseconds(1)));
+  release.signal();
+  EXPECT_TRUE(pool.shutDownWithin(kDeadline));
+  EXPECT_EQ(pool.figures().workers, 0u);
+}
+
 TEST(WorkerPool, RunsQueuesInTheOrderOfTheirSubmission) {
   WorkerPool pool(options(1));
   Holders holders;

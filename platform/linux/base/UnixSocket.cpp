@@ -25,6 +25,7 @@ namespace kyt {
 namespace {
 
 constexpr int kFirstActivatedDescriptor = 3;
+constexpr size_t kMostPassed = 253;  // descriptors that the kernel lets one message carry
 
 Error systemError(const std::string& what) {
   const int code = errno;
@@ -84,9 +85,10 @@ bool kernelTellsPeerProcess() {
   return true;
 }
 
+// Takes too many descriptors as well: those that find no room are closed by the kernel, within the call.
 StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) {
   iovec piece{buffer.data(), buffer.size()};
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * Limits::maxDescriptorsPerMessage)> control;
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostPassed)> control;
   msghdr message{};
   message.msg_iov = &piece;
   message.msg_iovlen = 1;
@@ -106,7 +108,8 @@ StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descripto
       descriptors.push_back(ownDescriptorOfPeer(received));
     }
   }
-  if ((message.msg_flags & MSG_CTRUNC) != 0) return {StreamStatus::truncated, 0};
+  const bool tooMany = descriptors.size() > Limits::maxDescriptorsPerMessage;
+  if (tooMany || (message.msg_flags & MSG_CTRUNC) != 0) return {StreamStatus::truncated, 0};
   if (count == 0) return {StreamStatus::ended, 0};
   return {StreamStatus::ok, static_cast<size_t>(count)};
 }
