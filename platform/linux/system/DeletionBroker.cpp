@@ -5,12 +5,8 @@
 #include <linux/capability.h>
 #include <poll.h>
 #include <signal.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
-#include <sys/time.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -102,21 +98,13 @@ Received receive(int socket, Request& request) {
   return received;
 }
 
-[[noreturn]] void serve(int socket) {
-  // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
-  for (const int ignored : {SIGINT, SIGTERM, SIGHUP, SIGPIPE}) ::signal(ignored, SIG_IGN);
+void serve(int socket) {
   ::signal(SIGCHLD, SIG_IGN);  // children leave nothing behind
   ::signal(SIGALRM, SIG_DFL);
   sigset_t none;
   ::sigemptyset(&none);
   ::sigprocmask(SIG_SETMASK, &none, nullptr);
-  ::prctl(PR_SET_NAME, "kyt-broker");
-  ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
-  ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
-  if (::chdir("/") != 0) ::_exit(1);
-  if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
-  ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
-  if (keepCapabilities(kTakingUsers) != 0) ::_exit(1);
+  if (::chdir("/") != 0 || keepCapabilities(kTakingUsers) != 0) ::_exit(1);
   static Request request;
   while (true) {
     request = {};
@@ -166,23 +154,10 @@ int awaitAnswer(int socket) {
 }  // namespace
 
 std::variant<std::unique_ptr<DeletionBroker>, std::string> DeletionBroker::start() {
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
-    return "socketpair: " + errorText(errno);
-  FileHandle mine(ends[0]), theirs(ends[1]);
-  const pid_t child = ::fork();
-  if (child < 0) return "fork: " + errorText(errno);
-  if (child == 0) serve(theirs.get());
-  const timeval patience = {2, 0};
-  ::setsockopt(mine.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
-  return std::unique_ptr<DeletionBroker>(new DeletionBroker(std::move(mine), child));
-}
-
-DeletionBroker::~DeletionBroker() {
-  { const FileHandle closed = std::move(socket_); }
-  int status = 0;
-  while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
-  }
+  auto process = HelperProcess::start("kyt-broker", serve);
+  if (auto* const problem = std::get_if<std::string>(&process)) return std::move(*problem);
+  return std::unique_ptr<DeletionBroker>(
+      new DeletionBroker(std::get<std::unique_ptr<HelperProcess>>(std::move(process))));
 }
 
 int DeletionBroker::remove(int file, int folder, std::string_view name, const PeerIdentity& peer) const {
@@ -202,7 +177,8 @@ int DeletionBroker::remove(int file, int folder, std::string_view name, const Pe
   const FileHandle mine(ends[0]);
   {
     const FileHandle theirs(ends[1]);
-    if (!sendRequest(socket_.get(), *request, {file, folder, theirs.get()})) return errno != 0 ? errno : EIO;
+    if (!sendRequest(process_->socket(), *request, {file, folder, theirs.get()}))
+      return errno != 0 ? errno : EIO;
   }
   return awaitAnswer(mine.get());
 }

@@ -19,7 +19,7 @@
 #include <variant>
 
 #include "platform/FileExtension.h"
-#include "platform/linux/system/Files.h"
+#include "platform/linux/system/HelperProcess.h"
 
 namespace kyt {
 
@@ -31,19 +31,15 @@ class DeletionBroker {
 
   // Only before there are threads and before the confinement. An error's text when it cannot be started.
   [[nodiscard]] static std::variant<std::unique_ptr<DeletionBroker>, std::string> start();
-  ~DeletionBroker();  // ends the process and waits for it
-  DeletionBroker(const DeletionBroker&) = delete;
-  DeletionBroker& operator=(const DeletionBroker&) = delete;
 
   // 0, or errno: ESTALE when the name is another file now, EPERM for a user that it may not serve, ETIMEDOUT.
   // Waits for the answer, some seconds at most.
   [[nodiscard]] int remove(int file, int folder, std::string_view name, const PeerIdentity& peer) const;
 
  private:
-  DeletionBroker(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
+  explicit DeletionBroker(std::unique_ptr<HelperProcess> process) : process_(std::move(process)) {}
 
-  FileHandle socket_;
-  const int32_t child_;
+  const std::unique_ptr<HelperProcess> process_;
 };
 
 }  // namespace kyt

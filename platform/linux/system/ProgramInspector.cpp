@@ -1,14 +1,9 @@
 #include "platform/linux/system/ProgramInspector.h"
 
 #include <linux/capability.h>
-#include <signal.h>
-#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
-#include <sys/time.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -55,17 +50,7 @@ CapabilitySet neededCapabilities() {
   return (held & looking) == 0 && ::geteuid() == 0 ? held : looking;
 }
 
-[[noreturn]] void serve(int socket) {
-  // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
-  ::signal(SIGINT, SIG_IGN);
-  ::signal(SIGTERM, SIG_IGN);
-  ::signal(SIGHUP, SIG_IGN);
-  ::signal(SIGPIPE, SIG_IGN);
-  ::prctl(PR_SET_NAME, "kyt-inspector");
-  ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
-  ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
-  if (socket > 0) ::syscall(SYS_close_range, 0U, static_cast<unsigned>(socket) - 1, 0U);
-  ::syscall(SYS_close_range, static_cast<unsigned>(socket) + 1, ~0U, 0U);
+void serve(int socket) {
   // It may be allowed to look at every process; so it can open nothing, which a look does not need.
   const rlimit none = {0, 0};
   if (::setrlimit(RLIMIT_NOFILE, &none) != 0 || keepCapabilities(neededCapabilities()) != 0) ::_exit(1);
@@ -110,37 +95,20 @@ std::string DirectProgramInspector::programPath(int32_t pid) {
 }
 
 std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspectorProcess::start() {
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
-    return "socketpair: " + errorText(errno);
-  FileHandle mine(ends[0]), theirs(ends[1]);
-  const pid_t child = ::fork();
-  if (child < 0) return "fork: " + errorText(errno);
-  if (child == 0) serve(theirs.get());
-  const timeval patience = {2, 0};
-  ::setsockopt(mine.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
-  ::setsockopt(mine.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
-  return std::unique_ptr<ProgramInspectorProcess>(new ProgramInspectorProcess(std::move(mine), child));
-}
-
-ProgramInspectorProcess::~ProgramInspectorProcess() {
-  {
-    MutexLock lock(mutex_);
-    const FileHandle closed = std::move(socket_);
-  }
-  int status = 0;
-  while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
-  }
+  auto process = HelperProcess::start("kyt-inspector", serve);
+  if (auto* const problem = std::get_if<std::string>(&process)) return std::move(*problem);
+  return std::unique_ptr<ProgramInspectorProcess>(
+      new ProgramInspectorProcess(std::get<std::unique_ptr<HelperProcess>>(std::move(process))));
 }
 
 std::variant<ProgramIdentity, int> ProgramInspectorProcess::runningProgram(int32_t pid) {
   MutexLock lock(mutex_);
-  return resultOf(ask(socket_.get(), pid));
+  return resultOf(ask(process_->socket(), pid));
 }
 
 std::string ProgramInspectorProcess::programPath(int32_t pid) {
   MutexLock lock(mutex_);
-  return ask(socket_.get(), pid).path;
+  return ask(process_->socket(), pid).path;
 }
 
 }  // namespace kyt

@@ -12,7 +12,7 @@
 #include <variant>
 
 #include "platform/Mutex.h"
-#include "platform/linux/system/Files.h"
+#include "platform/linux/system/HelperProcess.h"
 
 namespace kyt {
 
@@ -44,17 +44,15 @@ class ProgramInspectorProcess final : public ProgramInspector {
  public:
   // Only before there are threads and before the confinement. An error's text when it cannot be started.
   [[nodiscard]] static std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> start();
-  ~ProgramInspectorProcess() override;  // ends the process and waits for it
   // Waits for the answer, two seconds at most.
   [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(mutex_);
   [[nodiscard]] std::string programPath(int32_t pid) override EXCLUDES(mutex_);
 
  private:
-  ProgramInspectorProcess(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
+  explicit ProgramInspectorProcess(std::unique_ptr<HelperProcess> process) : process_(std::move(process)) {}
 
   Mutex mutex_;
-  FileHandle socket_ GUARDED_BY(mutex_);
-  const int32_t child_;
+  const std::unique_ptr<HelperProcess> process_ PT_GUARDED_BY(mutex_);
 };
 
 }  // namespace kyt
