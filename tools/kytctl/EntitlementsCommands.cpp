@@ -5,7 +5,6 @@
 #include <grp.h>
 #include <poll.h>
 #include <pwd.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/sysmacros.h>
@@ -25,14 +24,11 @@
 #include "platform/Log.h"
 #include "platform/TextEscape.h"
 #include "platform/linux/base/Descriptors.h"
+#include "platform/linux/base/UnixSocket.h"
 #include "platform/linux/system/EntitlementMatch.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "tools/kytctl/Commands.h"
-
-#ifndef SO_PEERPIDFD
-#define SO_PEERPIDFD 77
-#endif
 
 namespace kyt::tools {
 
@@ -110,18 +106,6 @@ bool hasEnded(const Descriptor& process) {
   return process.get() >= 0 && ::poll(&wanted, 1, 0) != 0;
 }
 
-// Whether the kernel tells the daemon which process is at the other end of a connection.
-bool kernelTellsProcess() {
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) return true;
-  const Descriptor one = ownDescriptor(ends[0]), other = ownDescriptor(ends[1]);
-  int pidfd = -1;
-  socklen_t size = sizeof pidfd;
-  if (::getsockopt(one.get(), SOL_SOCKET, SO_PEERPIDFD, &pidfd, &size) != 0) return errno != ENOPROTOOPT;
-  const Descriptor closed = ownDescriptor(pidfd);
-  return true;
-}
-
 Descriptor openProcess(int32_t pid) {
   return ownDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
 }
@@ -133,7 +117,7 @@ std::variant<Client, std::string> clientOfProcess(int32_t pid) {
   client.process = openProcess(pid);
   if (client.process.get() < 0)
     return errno == ESRCH ? "there is no process " + std::to_string(pid) : errorText(errno);
-  if (kernelTellsProcess()) client.peer.pidfd = openProcess(pid);
+  if (kernelTellsPeerProcess()) client.peer.pidfd = openProcess(pid);
   const std::string folder = "/proc/" + std::to_string(pid);
   client.peer.pid = pid;
   if (!readStatus(folder, client.peer)) return "process " + std::to_string(pid) + " cannot be looked at";
