@@ -77,8 +77,8 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
           category, backend->name().c_str());
       continue;
     }
-    Value result =
-        backend->sendMessage(left == 0 ? std::move(envelope) : envelope, timestamp, category, type, flag);
+    Value result = backend->sendMessage(left == 0 ? std::exchange(envelope, {}) : envelope, timestamp,
+                                        category, type, flag);
     if (result.isNull()) continue;
     class_.messageLog().writeToLogFile("[%@ -> sendMessageWithDictionary] %@", {key, result});
     const String& name = backend->name();
