@@ -27,12 +27,7 @@ class Connectivity : public ::testing::Test {
     ASSERT_TRUE(here_->connect("eth7", "10.77.0.2/24", *there_, "eth8", "10.77.0.1/24"));
     ASSERT_TRUE(here_->connect("wwan0", "10.79.0.2/24", *there_, "eth9", "10.79.0.1/24"));
     ASSERT_TRUE(there_->run("ip addr add 10.78.0.1/24 dev eth8"));
-    {
-      const NetworkNamespace::Entered entered(*there_);
-      TestHTTPServer::Options options;
-      options.address = "10.78.0.1";
-      server_ = std::make_unique<TestHTTPServer>(options);
-    }
+    server_ = TestHTTPServer::in(*there_, "10.78.0.1");
     daemon_.emplace(base());
   }
   void TearDown() override {

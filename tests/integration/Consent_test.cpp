@@ -35,20 +35,14 @@ class Consent : public ::testing::Test {
     }
     ASSERT_TRUE(here_->connect("eth7", "10.77.0.2/24", *there_, "eth8", std::string(kBagServer) + "/24"));
     ASSERT_TRUE(there_->run(std::string("ip addr add ") + kEventServer + "/24 dev eth8"));
-    bags_ = server(kBagServer);
-    events_ = server(kEventServer);
+    bags_ = TestHTTPServer::in(*there_, kBagServer);
+    events_ = TestHTTPServer::in(*there_, kEventServer);
     serveBag();
     daemon_.emplace(url(kBagServer, *bags_));
     daemon_->root().write("etc/kytreportingd/device.toml", "ReleaseType = \"Internal\"\ncountry = \"DE\"\n");
   }
   void TearDown() override {
     if (running_) endDaemon();
-  }
-  std::unique_ptr<TestHTTPServer> server(const char* address) {
-    const NetworkNamespace::Entered entered(*there_);
-    TestHTTPServer::Options options;
-    options.address = address;
-    return std::make_unique<TestHTTPServer>(options);
   }
   static std::string url(const char* address, const TestHTTPServer& server) {
     return std::string("http://") + address + ":" + std::to_string(server.port());

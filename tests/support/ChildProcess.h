@@ -46,14 +46,14 @@ inline std::string inChildProcess(const std::function<std::string()>& work,
   return text;
 }
 
+// From here on the mounts that this process makes are its own, and vanish with it. Whether it could be done.
+[[nodiscard]] inline bool unshareMounts() {
+  return ::unshare(CLONE_NEWNS) == 0 && ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+}
+
 // Whether a child may make mounts of its own: for root, unless this runs in a folder that is no mount (a plain chroot).
 inline bool mayMountOfItsOwn() {
-  return inChildProcess([]() -> std::string {
-           const bool own = ::unshare(CLONE_NEWNS) == 0 &&
-                            ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
-           return own ? "" : "no";
-         })
-      .empty();
+  return inChildProcess([]() -> std::string { return unshareMounts() ? "" : "no"; }).empty();
 }
 
 }  // namespace kyt

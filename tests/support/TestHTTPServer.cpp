@@ -17,6 +17,8 @@
 #include <stdexcept>
 #include <thread>
 
+#include "tests/support/NetworkNamespace.h"
+
 namespace kyt {
 namespace {
 
@@ -302,6 +304,14 @@ TestHTTPServer::TestHTTPServer() : TestHTTPServer(Options{}) {}
 TestHTTPServer::TestHTTPServer(Options options)
     : implementation_(std::make_unique<Implementation>(std::move(options))) {}
 TestHTTPServer::~TestHTTPServer() = default;
+
+std::unique_ptr<TestHTTPServer> TestHTTPServer::in(const NetworkNamespace& network,
+                                                   const std::string& address) {
+  const NetworkNamespace::Entered entered(network);
+  Options options;
+  options.address = address;
+  return std::make_unique<TestHTTPServer>(std::move(options));
+}
 
 void TestHTTPServer::setHandler(Handler handler) {
   std::lock_guard lock(implementation_->mutex_);

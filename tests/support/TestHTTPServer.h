@@ -20,6 +20,8 @@
 
 namespace kyt {
 
+class NetworkNamespace;
+
 class TestHTTPServer {
  public:
   using Headers = std::vector<std::pair<std::string, std::string>>;
@@ -67,6 +69,8 @@ class TestHTTPServer {
   TestHTTPServer();
   explicit TestHTTPServer(Options options);
   ~TestHTTPServer();
+  // One that listens in another network.
+  static std::unique_ptr<TestHTTPServer> in(const NetworkNamespace& network, const std::string& address);
   TestHTTPServer(const TestHTTPServer&) = delete;
   TestHTTPServer& operator=(const TestHTTPServer&) = delete;
 

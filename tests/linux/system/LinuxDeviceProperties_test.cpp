@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <openssl/sha.h>
-#include <sched.h>
 #include <stdlib.h>
 #include <sys/mount.h>
 #include <systemd/sd-id128.h>
@@ -257,10 +256,7 @@ TEST_F(LinuxDevicePropertiesTest, AnotherLocaltimeFileCountsFromTheNextMinute) {
     GTEST_SKIP() << "no zone files here";
   EXPECT_EQ(inChildProcess([&]() -> std::string {
               ::unsetenv("TZ");
-              if (::unshare(CLONE_NEWNS) != 0 ||
-                  ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
-                return "skip";
-              }
+              if (!unshareMounts()) return "skip";
               auto properties = make();
               const int64_t before = properties.secondsFromGMT({0, 0});
               if (::mount(zone.c_str(), "/etc/localtime", nullptr, MS_BIND, nullptr) != 0)

@@ -3,7 +3,6 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sched.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -151,8 +150,7 @@ TEST(MessageLogOnDisk, AFullDiskCostsTheFile) {
   if (::geteuid() != 0) GTEST_SKIP() << "mounting a small disk needs root";
   TemporaryFolder folder;
   const std::string said = inChildProcess([&]() -> std::string {
-    if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-        ::mount("tmpfs", folder.path().c_str(), "tmpfs", 0, "size=64k") != 0)
+    if (!unshareMounts() || ::mount("tmpfs", folder.path().c_str(), "tmpfs", 0, "size=64k") != 0)
       return "skip";
     RealLog log(folder.path());
     log.messages.writeToLogFile("%@", {"first"});

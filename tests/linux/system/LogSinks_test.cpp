@@ -2,19 +2,14 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sched.h>
-#include <sys/mount.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
-#include <cstring>
 #include <thread>
 #include <vector>
 
 #include "platform/linux/system/Files.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/TestJournal.h"
 
 namespace kyt {
 namespace {
@@ -74,28 +69,17 @@ TEST(StderrSink, AClosedEndLosesTheLineAndNothingElse) {
   sink.write(LogLevel::error, "x");
 }
 
-// A journal of the test's own at the fixed address, in a mount namespace of its own.
 TEST(JournalSink, SendsTheFieldsOfEachLine) {
   if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
   EXPECT_EQ(inChildProcess([]() -> std::string {
-              if (::unshare(CLONE_NEWNS) != 0 ||
-                  ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-                  ::mount("tmpfs", "/run", "tmpfs", 0, nullptr) != 0) {
-                return "no mount namespace";
-              }
+              if (!TestJournal::hideRun()) return "no mount namespace";
               if (JournalSink::isAvailable()) return "a journal without a socket";
               if (dynamic_cast<StderrSink*>(makeLogSink(LogTarget::automatic).get()) == nullptr)
                 return "no fallback";
               if (dynamic_cast<StderrSink*>(makeLogSink(LogTarget::journal).get()) == nullptr)
                 return "no fallback 2";
-              ::mkdir("/run/systemd", 0755);
-              ::mkdir("/run/systemd/journal", 0755);
-              const FileHandle journal(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-              sockaddr_un address = {};
-              address.sun_family = AF_UNIX;
-              std::strcpy(address.sun_path, "/run/systemd/journal/socket");
-              if (::bind(journal.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-                return "bind";
+              const TestJournal journal;
+              if (!journal.isOpen()) return "bind";
               if (!JournalSink::isAvailable()) return "the socket is not seen";
               if (dynamic_cast<StderrSink*>(makeLogSink(LogTarget::standardError).get()) == nullptr)
                 return "wrong sink";
@@ -104,9 +88,7 @@ TEST(JournalSink, SendsTheFieldsOfEachLine) {
               std::string all;
               for (LogLevel level : {LogLevel::debug, LogLevel::normal, LogLevel::error}) {
                 sink->write(level, "Class(operation): a\nPRIORITY=0\xff");
-                char buffer[4096];
-                const ssize_t count = ::recv(journal.get(), buffer, sizeof buffer, 0);
-                all += std::string(buffer, static_cast<size_t>(count > 0 ? count : 0)) + "--\n";
+                all += journal.nextEntry() + "--\n";
               }
               return all;
             }),

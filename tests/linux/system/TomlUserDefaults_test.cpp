@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sched.h>
 #include <signal.h>
 #include <sys/file.h>
 #include <sys/mount.h>
@@ -80,11 +79,8 @@ TEST_F(TomlUserDefaultsTest, AChangeCountsAtOnceAlsoWithinOneTick) {
 TEST_F(TomlUserDefaultsTest, AChangeCountsAtOnceOnAFileSystemWithCoarseTimes) {
   if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount a file system";
   EXPECT_EQ(inChildProcess([&]() -> std::string {
-              if (::unshare(CLONE_NEWNS) != 0 ||
-                  ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-                  ::mount("ramfs", folder_.path().c_str(), "ramfs", 0, nullptr) != 0) {
+              if (!unshareMounts() || ::mount("ramfs", folder_.path().c_str(), "ramfs", 0, nullptr) != 0)
                 return "no mount";
-              }
               auto defaults = make();
               folder_.write(kFile, "n = 100\n");
               const int file = ::open((folder_ / kFile).c_str(), O_WRONLY);

@@ -21,12 +21,7 @@ class CurlURLSessionConnectivity : public CurlURLSessionFixture {
     there_.emplace();
     ASSERT_TRUE(here_->connect("eth7", "10.77.0.2/24", *there_, "eth8", "10.77.0.1/24"));
     ASSERT_TRUE(there_->run("ip addr add 10.78.0.1/24 dev eth8 && ip route add default via 10.77.0.2"));
-    {
-      const NetworkNamespace::Entered entered(*there_);
-      TestHTTPServer::Options options;
-      options.address = "10.78.0.1";
-      server_ = std::make_unique<TestHTTPServer>(options);
-    }
+    server_ = TestHTTPServer::in(*there_, "10.78.0.1");
     entered_.emplace(*here_);
     options_.waitingRetryPeriod = 10min;  // what wakes a request is the kernel
   }
