@@ -70,7 +70,8 @@ TEST_F(LinuxUDPSocketTest, HearsNoStranger) {
 
 TEST_F(LinuxUDPSocketTest, CannotConnectToAnAddressThatIsNone) {
   const auto socket = open();
-  EXPECT_EQ(socket->connect(ipv4Address("dashboard.example.org"), 4000), EACCES);
+  const int error = socket->connect(ipv4Address("dashboard.example.org"), 4000);
+  EXPECT_TRUE(error == EACCES || error == ENETUNREACH) << error;  // the latter on a machine without a network
 }
 
 TEST_F(LinuxUDPSocketTest, AServerThatIsGoneIsAnErrorOfASend) {
