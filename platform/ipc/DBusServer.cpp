@@ -117,14 +117,15 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     connection->offer(listener_, *delegate_);
   }
 
-  // Closed by a worker of its user's: descriptors that were sent already can hold up who closes them.
+  // Counted before the client sees its end. Closed by a worker of its user's: descriptors that were sent already can
+  // hold up who closes them.
   void refuse(std::unique_ptr<Stream> stream, Reason reason, uint32_t user) {
-    SerialQueue::create("kyt.refused", context_->services.executor, uint64_t{user} + 1)
-        ->async([refused = std::move(stream)]() mutable { refused.reset(); });
     if (context_->services.counters.addAndMayLog(reason, context_->services.clock.monotonic())) {
       context_->services.log.normal("DBusServer(accept): connection of user %u refused: %s", user,
                                     reasonName(reason));
     }
+    SerialQueue::create("kyt.refused", context_->services.executor, uint64_t{user} + 1)
+        ->async([refused = std::move(stream)]() mutable { refused.reset(); });
   }
 
   const std::shared_ptr<ServerContext> context_;
