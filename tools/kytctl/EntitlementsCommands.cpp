@@ -1,34 +1,27 @@
 // Why a client is served or refused: the files and grants of entitlements.d, matched as the daemon matches them and told
 // criterion by criterion. Run by root it reads the files as the daemon's user, so that what that user cannot read counts
 // for nothing here too.
-#include <fcntl.h>
 #include <grp.h>
-#include <poll.h>
 #include <pwd.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <cstdarg>
 #include <cstdio>
-#include <fstream>
-#include <sstream>
 #include <string_view>
 
 #include "platform/Counters.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/TextEscape.h"
-#include "platform/linux/base/Descriptors.h"
-#include "platform/linux/base/UnixSocket.h"
 #include "platform/linux/system/EntitlementMatch.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/TomlEntitlements.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/EntitlementClient.h"
 
 namespace kyt::tools {
 
@@ -50,107 +43,11 @@ int cannotTell(const std::string& why) {
   return kCannotTell;
 }
 
-// ---- The client.
-
-struct Client {
-  PeerCredentials peer;
-  Descriptor process;      // to see that it has not ended meanwhile; empty for a user
-  std::string program;     // what its link says; empty when that may not be known
-  bool isProcess = false;  // otherwise any process of a user: its program and its label are not known
-};
-
-std::string named(const std::string& name, uint32_t number) {
-  return name.empty() ? std::to_string(number) : name + " (" + std::to_string(number) + ")";
-}
-std::string userText(uint32_t number) {
-  const passwd* const entry = ::getpwuid(number);
-  return named(entry == nullptr ? "" : entry->pw_name, number);
-}
-std::string groupText(uint32_t number) {
-  const group* const entry = ::getgrgid(number);
-  return named(entry == nullptr ? "" : entry->gr_name, number);
-}
-std::string groupsText(const Client& client) {
-  std::string text = groupText(client.peer.gid);
-  for (const uint32_t number : client.peer.groups)
-    if (number != client.peer.gid) text += ", " + groupText(number);
-  return text;
-}
-
-std::string labelOf(const std::string& folder) {
-  std::ifstream file(folder + "/attr/current", std::ios::binary);
-  std::string label;
-  std::getline(file, label);
-  return label.substr(0, label.find('\0'));
-}
-
-bool readStatus(const std::string& folder, PeerCredentials& peer) {
-  std::ifstream status(folder + "/status");
-  int found = 0;
-  for (std::string line; std::getline(status, line);) {
-    std::istringstream words(line);
-    std::string key;
-    uint32_t real = 0, number = 0;
-    words >> key;
-    if (key == "Uid:" && words >> real >> peer.uid) ++found;
-    if (key == "Gid:" && words >> real >> peer.gid) ++found;
-    if (key != "Groups:") continue;
-    while (words >> number) peer.groups.push_back(number);
-    ++found;
-  }
-  return found == 3;
-}
-
-bool hasEnded(const Descriptor& process) {
-  pollfd wanted = {process.get(), POLLIN, 0};
-  return process.get() >= 0 && ::poll(&wanted, 1, 0) != 0;
-}
-
-Descriptor openProcess(int32_t pid) {
-  return ownDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
-}
-
-// The descriptor comes first: alive in the end means that the number stood for this process all the time.
-std::variant<Client, std::string> clientOfProcess(int32_t pid) {
-  Client client;
-  client.isProcess = true;
-  client.process = openProcess(pid);
-  if (client.process.get() < 0)
-    return errno == ESRCH ? "there is no process " + std::to_string(pid) : errorText(errno);
-  if (kernelTellsPeerProcess()) client.peer.pidfd = openProcess(pid);
-  const std::string folder = "/proc/" + std::to_string(pid);
-  client.peer.pid = pid;
-  if (!readStatus(folder, client.peer)) return "process " + std::to_string(pid) + " cannot be looked at";
-  client.peer.securityLabel = labelOf(folder);
-  char target[4096];
-  const ssize_t length = ::readlink((folder + "/exe").c_str(), target, sizeof target);
-  if (length > 0) client.program.assign(target, static_cast<size_t>(length));
-  return client;
-}
-
-std::variant<Client, std::string> clientOfUser(const std::string& text) {
-  int64_t number = 0;
-  const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number);
-  const bool isNumber = parsed.ec == std::errc() && parsed.ptr == text.data() + text.size();
-  const auto user = userNumber(isNumber ? NameOrNumber(number) : NameOrNumber(text));
-  if (!user) return "there is no user \"" + text + "\"";
-  Client client;
-  client.peer.uid = client.peer.gid = *user;
-  const passwd* const entry = ::getpwuid(*user);
-  if (entry == nullptr) return client;
-  client.peer.gid = entry->pw_gid;
-  std::vector<gid_t> groups(65536);
-  int count = static_cast<int>(groups.size());
-  if (::getgrouplist(entry->pw_name, entry->pw_gid, groups.data(), &count) >= 0)
-    client.peer.groups.assign(groups.begin(), groups.begin() + count);
-  return client;
-}
-
-void sayClient(const Client& client) {
+void sayClient(const EntitlementClient& client) {
   if (client.isProcess)
     say("process %d runs %s", client.peer.pid,
         client.program.empty() ? "a program that may not be looked at" : client.program.c_str());
-  say("user %s, groups %s", userText(client.peer.uid).c_str(), groupsText(client).c_str());
+  say("user %s, groups %s", userText(client.peer.uid).c_str(), client.groupsText().c_str());
   if (!client.peer.securityLabel.empty()) say("security label %s", client.peer.securityLabel.c_str());
 }
 
@@ -233,7 +130,7 @@ enum class Answer : uint8_t { matches, unknown, differs };  // of several the la
 
 class Check {
  public:
-  Check(const Client& client, bool servicesView, ProgramInspector& inspector)
+  Check(const EntitlementClient& client, bool servicesView, ProgramInspector& inspector)
       : client_(client), servicesView_(servicesView), match_(client.peer, inspector) {}
 
   // Tells each criterion; all of them, so that a second fault is seen before the first is mended.
@@ -244,7 +141,7 @@ class Check {
            userNumber(*grant.user) ? "the client is " + userText(client_.peer.uid) : "there is no such user");
     if (grant.group)
       tell("group " + text(*grant.group), match_.isMember(*grant.group),
-           groupNumber(*grant.group) ? "the client is in " + groupsText(client_) : "there is no such group");
+           groupNumber(*grant.group) ? "the client is in " + client_.groupsText() : "there is no such group");
     if (grant.securityLabel) label(*grant.securityLabel);
     if (grant.executable) executable(*grant.executable);
     return answer_;
@@ -316,7 +213,7 @@ class Check {
             hidden);
   }
 
-  const Client& client_;
+  const EntitlementClient& client_;
   const bool servicesView_;
   EntitlementMatch match_;
   Answer answer_ = Answer::matches;
@@ -370,8 +267,8 @@ bool isGranted(const TomlEntitlementsOptions& options, const PeerCredentials& pe
   return entitlements.valueFor(peer, kEntitlement).boolValue();
 }
 
-int verdict(bool granted, bool mayBeGranted, const Client& client) {
-  if (client.isProcess && hasEnded(client.process)) return cannotTell("the process has ended meanwhile");
+int verdict(bool granted, bool mayBeGranted, const EntitlementClient& client) {
+  if (client.hasEnded()) return cannotTell("the process has ended meanwhile");
   if (granted) {
     say("granted: this client is served");
     return kGranted;
@@ -388,9 +285,10 @@ int entitlementsCheckCommand(const std::string& root, const CheckOptions& option
     failed("say either --pid or --user");
     return kCannotTell;
   }
-  auto found = options.pid != 0 ? clientOfProcess(options.pid) : clientOfUser(options.user);
+  auto found =
+      options.pid != 0 ? EntitlementClient::ofProcess(options.pid) : EntitlementClient::ofUser(options.user);
   if (const auto* wrong = std::get_if<std::string>(&found)) return cannotTell(*wrong);
-  const Client& client = std::get<Client>(found);
+  const EntitlementClient& client = std::get<EntitlementClient>(found);
   sayClient(client);
 
   const auto daemon = daemonUser(root);
