@@ -35,7 +35,6 @@ class MemoryStream final : public Stream {
   [[nodiscard]] StreamResult read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) override;
   [[nodiscard]] StreamResult write(std::string_view bytes) override;
   [[nodiscard]] PeerCredentials peer() override { return std::move(pipe_->credentials); }
-  [[nodiscard]] std::string peerExecutable() const override { return {}; }
   [[nodiscard]] int descriptor() const override { return descriptor_; }
 
  private:

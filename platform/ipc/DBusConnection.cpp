@@ -64,13 +64,11 @@ std::string DBusConnection::description() const {
   std::snprintf(text, sizeof text, "%llu of process %d, user %u", static_cast<unsigned long long>(number_),
                 process_, user_);
   std::string line = text;
-  std::string executable = stream_ ? stream_->peerExecutable() : std::string();
-  // Worth asking for only where somebody reads the line about a refusal, which has this description.
-  const bool tellsRefusal = refused_ && peer_ != nullptr && context_->services.log.debugEnabled();
-  if (executable.empty() && tellsRefusal) executable = context_->services.entitlements.executableOf(*peer_);
+  // More is worth asking for only where somebody reads the line about a refusal, which has this description.
+  if (!refused_ || peer_ == nullptr || !context_->services.log.debugEnabled()) return line;
+  const std::string executable = context_->services.entitlements.executableOf(*peer_);
   if (!executable.empty()) line.append(" (").append(executable).append(")");
-  if (tellsRefusal)
-    line.append(", see \"kytctl entitlements check --pid ").append(std::to_string(process_)).append("\",");
+  line.append(", see \"kytctl entitlements check --pid ").append(std::to_string(process_)).append("\",");
   return line;
 }
 

@@ -41,8 +41,6 @@ class Stream {
   [[nodiscard]] virtual StreamResult write(std::string_view bytes) = 0;
   // What the kernel recorded about the peer when it connected: the same answer each time.
   [[nodiscard]] virtual PeerCredentials peer() = 0;
-  // The peer's executable, for log lines; empty when it may not be known.
-  [[nodiscard]] virtual std::string peerExecutable() const = 0;
   // For the reactor.
   [[nodiscard]] virtual int descriptor() const = 0;
 };

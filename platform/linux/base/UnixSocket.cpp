@@ -146,16 +146,6 @@ PeerCredentials UnixStream::peer() {
   return peer;
 }
 
-std::string UnixStream::peerExecutable() const {
-  ucred credentials{};
-  socklen_t size = sizeof credentials;
-  if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0) return {};
-  char target[256];
-  const std::string link = "/proc/" + std::to_string(credentials.pid) + "/exe";
-  const ssize_t length = ::readlink(link.c_str(), target, sizeof target);
-  return length > 0 ? std::string(target, static_cast<size_t>(length)) : std::string();
-}
-
 std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bindAt(const std::string& path) {
   sockaddr_un address;
   if (!fillAddress(path, address)) {

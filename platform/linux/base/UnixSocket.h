@@ -21,7 +21,6 @@ class UnixStream final : public Stream {
   [[nodiscard]] StreamResult read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) override;
   [[nodiscard]] StreamResult write(std::string_view bytes) override;
   [[nodiscard]] PeerCredentials peer() override;
-  [[nodiscard]] std::string peerExecutable() const override;
   [[nodiscard]] int descriptor() const override { return socket_.get(); }
 
  private:

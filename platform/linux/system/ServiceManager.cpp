@@ -1,6 +1,5 @@
 #include "platform/linux/system/ServiceManager.h"
 
-#include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -16,8 +15,8 @@
 
 #include "platform/SerialQueue.h"
 #include "platform/TextEscape.h"
+#include "platform/linux/system/Files.h"
 #include "platform/linux/system/LogSinks.h"
-#include "platform/linux/system/SystemdLibrary.h"
 
 namespace kyt {
 namespace {
@@ -62,26 +61,6 @@ void tellOrSay(const std::string& state) {
 }
 
 }  // namespace
-
-std::variant<FileHandle, std::string> ServiceManager::takeListeningSocket() {
-  if (std::getenv("LISTEN_FDS") == nullptr) return FileHandle();
-  const auto loaded = SystemdLibrary::load();
-  if (const auto* problem = std::get_if<std::string>(&loaded)) return "LISTEN_FDS: " + *problem;
-  const auto& systemd = std::get<SystemdLibrary>(loaded);
-  const int count = systemd.listenDescriptors(1);
-  if (count < 0) return "LISTEN_FDS: " + errorText(-count);
-  if (count == 0) return FileHandle();
-  FileHandle socket(SD_LISTEN_FDS_START);
-  for (int extra = 1; extra < count; ++extra) ::close(SD_LISTEN_FDS_START + extra);
-  if (count > 1) return std::string("LISTEN_FDS: more than one socket was handed over");
-  if (systemd.isSocket(socket.get(), AF_UNIX, SOCK_STREAM, 1) <= 0) {
-    return std::string("LISTEN_FDS: what was handed over is no listening Unix stream socket");
-  }
-  const int flags = ::fcntl(socket.get(), F_GETFL);
-  if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) != 0)
-    return "LISTEN_FDS: " + errorText(errno);
-  return socket;
-}
 
 void ServiceManager::ready(const std::string& status) {
   tellOrSay("READY=1\nSTATUS=" + escapedText(status));

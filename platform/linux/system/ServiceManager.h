@@ -1,5 +1,5 @@
-// The service manager's side of the process: sockets it hands over, what it is told, the service class of the
-// thread, and the process transaction that decides about ending when idle.
+// The service manager's side of the process: what it is told, the service class of the thread, and the process
+// transaction that decides about ending when idle. (The socket that it hands over: UnixSocketAcceptor.)
 #pragma once
 
 #include <cstdint>
@@ -7,22 +7,16 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <variant>
 
 #include "platform/Clock.h"
 #include "platform/Mutex.h"
 #include "platform/System.h"
 #include "platform/Timer.h"
-#include "platform/linux/system/Files.h"
 
 namespace kyt {
 
 class ServiceManager {
  public:
-  // The listening socket that the process was started with (LISTEN_FDS): none when it was not, an error's
-  // text when what was handed over is not exactly one listening Unix stream socket. Answers the socket once;
-  // the environment forgets it.
-  [[nodiscard]] static std::variant<FileHandle, std::string> takeListeningSocket();
   // Told over NOTIFY_SOCKET; nothing happens without one. Waits two seconds at most when nobody reads there.
   // `status` is one line for people.
   static void ready(const std::string& status);

@@ -7,8 +7,6 @@ namespace kyt {
 std::variant<SystemdLibrary, std::string> SystemdLibrary::load(const char* name) {
   SharedLibrary library(name);
   SystemdLibrary functions;
-  library.resolve(functions.listenDescriptors, "sd_listen_fds");
-  library.resolve(functions.isSocket, "sd_is_socket");
   library.resolve(functions.journalSend, "sd_journal_sendv");
   if (library.problem()) return *library.problem();
   return functions;

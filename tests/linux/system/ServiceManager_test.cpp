@@ -1,6 +1,5 @@
 #include "platform/linux/system/ServiceManager.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
 #include <sys/resource.h>
@@ -14,6 +13,7 @@
 #include "platform/SerialQueue.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
+#include "platform/linux/system/Files.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -25,51 +25,6 @@ sockaddr_un addressOf(const std::string& path) {
   address.sun_family = AF_UNIX;
   std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
   return address;
-}
-
-// What taking the socket answers in a process that was handed the descriptors 3 … 2+count.
-std::string taken(const std::string& socketPath, int type, bool listens, int count) {
-  return inChildProcess([&]() -> std::string {
-    const int socket = ::socket(AF_UNIX, type, 0);
-    const sockaddr_un address = addressOf(socketPath);
-    if (::bind(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) return "bind";
-    if (listens && ::listen(socket, 5) != 0) return "listen";
-    for (int i = 0; i < count; ++i) {
-      if (socket != 3 + i && ::dup2(socket, 3 + i) < 0) return "dup2";
-    }
-    ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
-    ::setenv("LISTEN_FDS", std::to_string(count).c_str(), 1);
-    auto result = ServiceManager::takeListeningSocket();
-    if (const auto* error = std::get_if<std::string>(&result)) return *error;
-    const auto& handle = std::get<FileHandle>(result);
-    if (::getenv("LISTEN_FDS") != nullptr) return "the environment still tells of it";
-    if (!handle) return "none";
-    if ((::fcntl(handle.get(), F_GETFL) & O_NONBLOCK) == 0) return "blocking";
-    if ((::fcntl(handle.get(), F_GETFD) & FD_CLOEXEC) == 0) return "inherited";
-    auto again = ServiceManager::takeListeningSocket();
-    return std::get<FileHandle>(again) ? "twice" : "taken";
-  });
-}
-
-TEST(ServiceManager, AdoptsTheOneListeningSocket) {
-  const TemporaryFolder folder;
-  EXPECT_EQ(taken(folder / "1", SOCK_STREAM, true, 1), "taken");
-  EXPECT_EQ(taken(folder / "2", SOCK_STREAM, true, 2), "LISTEN_FDS: more than one socket was handed over");
-  EXPECT_EQ(taken(folder / "3", SOCK_STREAM, false, 1),
-            "LISTEN_FDS: what was handed over is no listening Unix stream socket");
-  EXPECT_EQ(taken(folder / "4", SOCK_DGRAM, false, 1),
-            "LISTEN_FDS: what was handed over is no listening Unix stream socket");
-}
-
-TEST(ServiceManager, WithoutActivationThereIsNoSocket) {
-  EXPECT_EQ(inChildProcess([]() -> std::string {
-              ::unsetenv("LISTEN_FDS");
-              ::unsetenv("LISTEN_PID");
-              auto result = ServiceManager::takeListeningSocket();
-              return std::holds_alternative<FileHandle>(result) && !std::get<FileHandle>(result) ? "none"
-                                                                                                 : "some";
-            }),
-            "none");
 }
 
 TEST(ServiceManager, TellsItsStateWhenSomeoneListens) {
