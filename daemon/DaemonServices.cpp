@@ -130,6 +130,7 @@ DaemonServices::~DaemonServices() = default;
 
 void DaemonServices::resume() {
   listener_.resume();
+  resumed_ = true;
   if (const auto interval = Watchdog::requestedInterval())
     watchdog_.emplace(*interval, *reactor_, workers_, &ServiceManager::alive);
 }
@@ -139,9 +140,11 @@ bool DaemonServices::isOutstanding() const {
   return urlSessions_.outstanding() != 0 || udpSockets_.openSockets() != 0;
 }
 
-// The idle time counts anew from the end of what a session left behind.
+// The idle time counts anew from the end of what a session left behind. A connection may be on its way to becoming a
+// session, and before the start is over nothing here may be looked at.
 bool DaemonServices::isIdle() {
-  if (agent_.sessionCount() != 0 || isOutstanding()) return false;
+  if (!resumed_ || listener_.connectionCount() != 0 || agent_.sessionCount() != 0 || isOutstanding())
+    return false;
   idle_();
   return true;
 }

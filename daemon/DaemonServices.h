@@ -2,6 +2,7 @@
 // reverse. Made by runDaemon() after the process is confined.
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -118,6 +119,7 @@ class DaemonServices {
   Mutex backendClassLock_;
   StorebagFetcher fetcher_;
   ReportingdSessionClass sessionClass_;
+  std::atomic<bool> resumed_{false};
   std::shared_ptr<SerialQueue> queue_;  // the daemon's own
   LinuxProcessTransaction transaction_;
   ReportingdAgent agent_;

@@ -104,7 +104,9 @@ class ReactorTurns : public testing::Test {
 
 TEST_F(ReactorTurns, RunFrequentShortWorkWithoutAWorker) {
   ASSERT_TRUE(warmUp());
-  EXPECT_EQ(reactor_->threads(), 2u) << "one that leads and one that stands by";
+  // Where the machine is busy, short work may take long enough to need one more for a moment.
+  EXPECT_TRUE(eventually([&] { return reactor_->threads() == 2U; }))
+      << "one that leads and one that stands by";
 }
 
 TEST_F(ReactorTurns, LeaveRareWorkToTheExecutor) {
