@@ -132,18 +132,13 @@ void DBusConnection::closeStream() {
   Watch watch;
   {
     MutexLock lock(watchMutex_);
-    if (std::exchange(closed_, true)) return;
+    if (closed_.exchange(true)) return;
     watch = std::move(watch_);
   }
   watch.cancel();
   output_->close();
   stream_.reset();
   context_->remove(number_, user_);
-}
-
-bool DBusConnection::closed() {
-  MutexLock lock(watchMutex_);
-  return closed_;
 }
 
 void DBusConnection::scheduleTurn() {
@@ -158,12 +153,14 @@ void DBusConnection::armRead() {
 // Asks the reactor for one report, of this and of what is asked for already.
 void DBusConnection::armWatch(unsigned events) {
   MutexLock lock(watchMutex_);
-  if (closed_ || (armed_ & events) == events) return;
-  armed_ |= events;
+  if (closed_) return;
+  const unsigned armed = armed_.fetch_or(events);
+  if ((armed & events) == events) return;
+  const unsigned wanted = armed | events | ready::oneShot;
   if (watch_) {
-    if (watch_.modify(armed_ | ready::oneShot)) return;
+    if (watch_.modify(wanted)) return;
   } else {
-    watch_ = context_->services.reactor.watch(stream_->descriptor(), armed_ | ready::oneShot,
+    watch_ = context_->services.reactor.watch(stream_->descriptor(), wanted,
                                               [weak = weak_from_this()](unsigned happened) {
                                                 if (const auto self = weak.lock())
                                                   self->handleReady(happened);
@@ -179,13 +176,9 @@ void DBusConnection::armWatch(unsigned events) {
 // On the reactor's thread.
 void DBusConnection::handleReady(unsigned events) {
   const bool gone = (events & (ready::ended | ready::failed)) != 0;
-  unsigned again = 0;
-  {
-    MutexLock lock(watchMutex_);
-    if (closed_) return;
-    if (!gone) again = armed_ & ~events;
-    armed_ = 0;
-  }
+  if (closed_) return;
+  const unsigned armed = armed_.exchange(0);
+  const unsigned again = gone ? 0 : armed & ~events;
   // A client that has ended its side is read to the end and then ended, even if it takes no more replies: the
   // turn sees to all of it, and nothing is asked of the reactor here that it would report again at once.
   if (gone) peerGone_ = true;

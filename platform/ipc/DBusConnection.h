@@ -86,7 +86,7 @@ class DBusConnection final : public Connection,
   void start();
   void end(bool broken, bool waitForOutput);
   void closeStream();
-  [[nodiscard]] bool closed();
+  [[nodiscard]] bool closed() const { return closed_; }
   void scheduleTurn();
   void armRead();
   void armWatch(unsigned events);
@@ -131,11 +131,12 @@ class DBusConnection final : public Connection,
   bool refused_ = false;  // what was asked for was not granted
   bool resumed_ = false, started_ = false, ended_ = false;
 
-  // Guarded: the reactor's thread, the queue and writers arm the watch.
+  // The queue, the reactor's thread and writers arm the watch. The mutex is held over the system call; the handler does
+  // without it, since what was armed may be ready at once.
   Mutex watchMutex_;
   Watch watch_ GUARDED_BY(watchMutex_);
-  unsigned armed_ GUARDED_BY(watchMutex_) = 0;
-  bool closed_ GUARDED_BY(watchMutex_) = false;
+  std::atomic<unsigned> armed_{0};
+  std::atomic<bool> closed_{false};  // set under the mutex
 };
 
 }  // namespace kyt

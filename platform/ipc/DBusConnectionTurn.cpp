@@ -8,6 +8,8 @@
 namespace kyt {
 namespace {
 
+constexpr unsigned kManyCalls = 16;
+
 // Gathers the replies of a turn; gives them up early when the thread is about to block.
 class HeldOutput {
  public:
@@ -94,11 +96,14 @@ DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress&
     }
   }
   size_t consumed = 0;
+  const unsigned before = progress.calls;
   const Step handled = handleBytes(bytes, consumed, progress);
   keepRest(bytes.subspan(consumed));
   if (handled != Step::more) return handled;
   const bool leftWhole = !kept_.empty() && kept_.size() >= needed_;
-  return leftWhole ? Step::more : after;
+  // A client that sent many calls has mostly sent more meanwhile: looking costs less than being told.
+  const bool mayHaveMore = after == Step::drained && progress.calls - before >= kManyCalls;
+  return leftWhole || mayHaveMore ? Step::more : after;
 }
 
 bool DBusConnection::mustPause() const {

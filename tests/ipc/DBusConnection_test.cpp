@@ -176,6 +176,15 @@ TEST_F(DBusConnectionTest, AnswersThePipelinedCallsOfATurnInOneWrite) {
   executor_.runAll();
   EXPECT_EQ(session_->calls, 100);
   EXPECT_EQ(pipe_->writes, 1u);
+  EXPECT_EQ(pipe_->reads, 2u) << "who sent many calls may have sent more meanwhile";
+  EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, ReadsOnceForFewCalls) {
+  shakeHands();
+  say(displayURLCalls(10));
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 10);
   EXPECT_EQ(pipe_->reads, 1u) << "a read that does not fill the buffer is the last";
   EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
 }

@@ -1,7 +1,9 @@
 // What handlers and timers give to queues is gathered while one batch of events is handled. At a quiet rate
 // the first few of these queues are then run right here; the others go to their executors.
 //
-// One mutex guards registrations and timers; it is never held while a handler runs or a queue is given work.
+// One mutex guards registrations and timers; it is never held while a handler runs or a queue is given work. Nor while a
+// watch is changed, for which each registration has a mutex of its own: what is asked for is often ready already, and
+// the reactor's thread, awake at once, would have to wait for who asked.
 // An event carries the number of its slot and the slot's generation, so that one harvested before its watch
 // was destroyed finds nothing.
 #include "platform/linux/base/EpollReactor.h"
@@ -120,10 +122,10 @@ class EpollReactor::Registration final : public Watch::State {
   friend class Implementation;
   const std::shared_ptr<Implementation> reactor_;
   const int descriptor_;
-  // Guarded by the reactor's mutex.
-  unsigned events_;
-  uint32_t slot_ = 0;
-  bool registered_ = false;
+  std::atomic<unsigned> events_;
+  uint64_t tag_ = 0;  // number and generation of its slot, constant once it is registered
+  Mutex changing_;    // held over the system call, so that none follows the end of the watch
+  bool registered_ GUARDED_BY(changing_) = false;
   // The reactor's thread's.
   Handler handler_;
 };
@@ -192,7 +194,8 @@ class EpollReactor::Implementation : public std::enable_shared_from_this<Impleme
   [[nodiscard]] bool runAside(QueuesAside queues);
   void dispatch(uint64_t tag, uint32_t events);
   void fireTimers();
-  [[nodiscard]] bool control(int operation, const Registration& registration) REQUIRES(mutex_);
+  [[nodiscard]] bool control(int operation, const Registration& registration)
+      REQUIRES(registration.changing_);
   void insert(std::shared_ptr<Timer> timer) REQUIRES(mutex_);
   [[nodiscard]] std::shared_ptr<Timer> remove(Timer& timer) REQUIRES(mutex_);
   void setAlarm() REQUIRES(mutex_);
@@ -344,7 +347,7 @@ void EpollReactor::Implementation::dispatch(uint64_t tag, uint32_t events) {
 bool EpollReactor::Implementation::control(int operation, const Registration& registration) {
   epoll_event event{};
   event.events = epollEvents(registration.events_);
-  event.data.u64 = uint64_t{slots_[registration.slot_].generation} << 32 | registration.slot_;
+  event.data.u64 = registration.tag_;
   return epoll_ctl(epoll_.get(), operation, registration.descriptor_, &event) == 0;
 }
 
@@ -357,36 +360,42 @@ Watch EpollReactor::Implementation::watch(int descriptor, unsigned events, Handl
     freeSlots_.push_back(static_cast<uint32_t>(slots_.size()));
     slots_.emplace_back();
   }
-  registration->slot_ = freeSlots_.back();
+  const uint32_t slot = freeSlots_.back();
+  registration->tag_ = uint64_t{slots_[slot].generation} << 32 | slot;
+  MutexLock changing(registration->changing_);
   if (!control(EPOLL_CTL_ADD, *registration)) return {};
   freeSlots_.pop_back();
   registration->registered_ = true;
-  slots_[registration->slot_].registration = registration;
+  slots_[slot].registration = registration;
   return Watch(registration);
 }
 
 bool EpollReactor::Implementation::modify(Registration& registration, unsigned events) {
-  MutexLock lock(mutex_);
+  MutexLock changing(registration.changing_);
   if (!registration.registered_) return false;
   registration.events_ = events;
   return control(EPOLL_CTL_MOD, registration);
 }
 
 bool EpollReactor::Implementation::rearm(Registration& registration) {
-  MutexLock lock(mutex_);
+  MutexLock changing(registration.changing_);
   return registration.registered_ && control(EPOLL_CTL_MOD, registration);
 }
 
 void EpollReactor::Implementation::cancel(Registration& registration) {
+  {
+    MutexLock changing(registration.changing_);
+    if (!registration.registered_) return;
+    registration.registered_ = false;
+    (void)control(EPOLL_CTL_DEL, registration);
+  }
   std::shared_ptr<Registration> dropped;  // destroyed without the lock
   MutexLock lock(mutex_);
-  if (!registration.registered_) return;
-  registration.registered_ = false;
-  (void)control(EPOLL_CTL_DEL, registration);
-  Slot& slot = slots_[registration.slot_];
+  const auto number = static_cast<uint32_t>(registration.tag_);
+  Slot& slot = slots_[number];
   dropped = std::move(slot.registration);
   ++slot.generation;
-  freeSlots_.push_back(registration.slot_);
+  freeSlots_.push_back(number);
   if (runningOn_ == std::this_thread::get_id()) return;
   ++awaitingHandler_;
   while (running_ == &registration) handlerDone_.wait(mutex_);
