@@ -26,6 +26,7 @@
 #include "platform/ipc/ConnectionOutput.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/Listener.h"
+#include "platform/ipc/MessageReader.h"
 #include "platform/ipc/ServerContext.h"
 
 namespace kyt {
@@ -69,6 +70,7 @@ class DBusConnection final : public Connection,
   struct Progress {
     unsigned calls = 0;
     size_t bytes = 0;
+    HeaderMemory header;
   };
 
   void turn();
@@ -77,7 +79,7 @@ class DBusConnection final : public Connection,
   Step readMore(std::span<std::byte> buffer, size_t& bytes);
   Step handleBytes(std::span<const std::byte> bytes, size_t& consumed, Progress& progress);
   Step handleHandshake(std::span<const std::byte> bytes, size_t& consumed);
-  Step handleMessage(std::span<const std::byte> bytes, size_t& consumed);
+  Step handleMessage(std::span<const std::byte> bytes, size_t& consumed, HeaderMemory& header);
   Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken);
   [[nodiscard]] bool mustPause() const;
   void keepRest(std::span<const std::byte> rest);

@@ -151,7 +151,7 @@ DBusConnection::Step DBusConnection::handleBytes(std::span<const std::byte> byte
   while (consumed < bytes.size()) {
     size_t taken = 0;
     const Step step = handshake_ ? handleHandshake(bytes.subspan(consumed), taken)
-                                 : handleMessage(bytes.subspan(consumed), taken);
+                                 : handleMessage(bytes.subspan(consumed), taken, progress.header);
     consumed += taken;
     if (step != Step::more) return step;
     if (taken == 0) break;  // not a whole message
@@ -186,9 +186,10 @@ DBusConnection::Step DBusConnection::handleHandshake(std::span<const std::byte> 
   return Step::more;
 }
 
-DBusConnection::Step DBusConnection::handleMessage(std::span<const std::byte> bytes, size_t& consumed) {
+DBusConnection::Step DBusConnection::handleMessage(std::span<const std::byte> bytes, size_t& consumed,
+                                                   HeaderMemory& header) {
   Message message;
-  const Frame frame = readMessage(bytes, context_->services.limits.maxMessageBytes, message);
+  const Frame frame = readMessage(bytes, context_->services.limits.maxMessageBytes, message, &header);
   switch (frame.status) {
     case FrameStatus::incomplete:
       needed_ = frame.size;

@@ -165,13 +165,34 @@ class HeaderParser {
   unsigned seen_ = 0;
 };
 
+const char* parseHeader(const uint8_t* header, size_t end, Message& message) {
+  return HeaderParser(header, wire::kFixedHeaderBytes, end, message).parse();
+}
+
 Frame malformed(const char* problem) {
   return {FrameStatus::malformed, 0, problem};
 }
 
 }  // namespace
 
-Frame readMessage(std::span<const std::byte> bytes, uint64_t maxMessageBytes, Message& message) {
+const char* HeaderMemory::parse(const uint8_t* header, size_t end, Message& message) {
+  constexpr size_t kFields =
+      12;  // before them: flags, length of the body and serial differ, order and type must not
+  if (end > sizeof bytes_) return parseHeader(header, end, message);
+  if (end != end_ || std::memcmp(header + kFields, bytes_ + kFields, end - kFields) != 0 ||
+      message.type != message_.type || message.swapped != message_.swapped) {
+    end_ = 0;
+    message_ = message;
+    std::memcpy(bytes_, header, end);
+    if (const char* problem = parseHeader(bytes_, end, message_)) return problem;
+    end_ = end;
+  }
+  message = message_;
+  return nullptr;
+}
+
+Frame readMessage(std::span<const std::byte> bytes, uint64_t maxMessageBytes, Message& message,
+                  HeaderMemory* memory) {
   if (bytes.size() < wire::kFixedHeaderBytes)
     return {FrameStatus::incomplete, wire::kFixedHeaderBytes, nullptr};
   const auto* begin = reinterpret_cast<const uint8_t*>(bytes.data());
@@ -191,19 +212,21 @@ Frame readMessage(std::span<const std::byte> bytes, uint64_t maxMessageBytes, Me
   }
   if (bytes.size() < total) return {FrameStatus::incomplete, static_cast<size_t>(total), nullptr};
 
-  message = Message{};
-  message.flags = begin[2];
-  message.swapped = swapped;
-  message.serial = serial;
   for (uint64_t i = fieldsEnd; i < bodyStart; ++i) {
     if (begin[i] != 0) return malformed("header padding is not zero");
   }
   if (begin[1] > static_cast<uint8_t>(wire::MessageType::signal)) {
     return {FrameStatus::skip, static_cast<size_t>(total), nullptr};
   }
+  message = Message{};
   message.type = static_cast<wire::MessageType>(begin[1]);
-  HeaderParser parser(begin, wire::kFixedHeaderBytes, static_cast<size_t>(fieldsEnd), message);
-  if (const char* problem = parser.parse()) return malformed(problem);
+  message.swapped = swapped;
+  const auto end = static_cast<size_t>(fieldsEnd);
+  const char* problem =
+      memory != nullptr ? memory->parse(begin, end, message) : parseHeader(begin, end, message);
+  if (problem != nullptr) return malformed(problem);
+  message.flags = begin[2];
+  message.serial = serial;
   message.body = bytes.subspan(static_cast<size_t>(bodyStart), static_cast<size_t>(bodyLength));
   if (bodyLength != 0 && message.signature.empty()) return malformed("a body without a signature");
   return {FrameStatus::complete, static_cast<size_t>(total), nullptr};

@@ -3,6 +3,10 @@
 
 #include <gtest/gtest.h>
 
+#include <string>
+#include <tuple>
+#include <vector>
+
 #include "WireTestSupport.h"
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/BodyValidator.h"
@@ -109,6 +113,66 @@ FrameStatus statusWith(std::string bytes, size_t at, std::string_view replacemen
   bytes.replace(at, replacement.size(), replacement);
   Message message;
   return frame(bytes, message).status;
+}
+
+// What two readings of the same bytes must agree about.
+auto whatWasRead(const Frame& frame, const Message& m) {
+  const bool whole = frame.status == FrameStatus::complete;
+  const std::string_view problem = frame.problem != nullptr ? frame.problem : "";
+  return std::tuple(
+      frame.status, frame.size, problem,
+      !whole
+          ? std::tuple<uint8_t, bool, uint32_t, uint32_t, uint32_t, const std::byte*, size_t>()
+          : std::tuple(m.flags, m.swapped, m.serial, m.replySerial, m.unixFds, m.body.data(), m.body.size()),
+      !whole ? std::tuple<std::string_view, std::string_view, std::string_view, std::string_view>()
+             : std::tuple(m.path, m.interface, m.member, m.signature));
+}
+
+void expectTheSame(HeaderMemory& memory, std::string_view bytes, const std::string& what) {
+  Message plain, remembered;
+  const Frame expected = frame(bytes, plain);
+  const Frame read = readMessage(test::bytesOf(bytes), test::kLimit, remembered, &memory);
+  EXPECT_EQ(whatWasRead(read, remembered), whatWasRead(expected, plain)) << what;
+}
+
+TEST(MessageReader, ReadsTheSameWhateverTheHeaderBeforeWas) {
+  std::vector<std::string> messages = everyCall();
+  const size_t calls = messages.size();
+  for (size_t i = 0; i < calls; ++i) messages.push_back(test::ByteOrderSwapper::swapped(messages[i]));
+  messages.push_back(messages[0]);
+  messages.back()[2] = 1;   // expects no reply
+  messages.back()[8] = 99;  // has another serial
+  for (size_t first = 0; first < messages.size(); ++first) {
+    for (size_t second = 0; second < messages.size(); ++second) {
+      HeaderMemory memory;
+      const std::string what = std::to_string(first) + ", " + std::to_string(second);
+      for (const size_t i : {first, first, second, first}) expectTheSame(memory, messages[i], what);
+    }
+  }
+}
+
+TEST(MessageReader, ChecksAHeaderThatDiffersFromTheOneBeforeInAnyByte) {
+  const std::string good = everyCall().front();
+  HeaderMemory memory;
+  for (size_t at = 0; at < 160; ++at) {
+    for (const char change : {char(1), char(0x20), char(0x80)}) {
+      std::string other = good;
+      other[at] = static_cast<char>(other[at] ^ change);
+      const std::string what = "byte " + std::to_string(at);
+      for (const std::string& bytes : {good, other, other, good}) expectTheSame(memory, bytes, what);
+    }
+  }
+}
+
+TEST(MessageReader, ReadsAHeaderThatIsTooLongToBeRemembered) {
+  std::string longer;
+  MessageWriter writer(longer);
+  const std::string member(255, 'm');
+  writer.beginCall(1, {.member = member, .signature = ""});
+  ASSERT_TRUE(writer.end());
+  HeaderMemory memory;
+  for (const std::string& bytes : {everyCall().front(), longer, longer, everyCall().front()})
+    expectTheSame(memory, bytes, "long");
 }
 
 TEST(MessageReader, RefusesWhatTheFixedHeaderMayNotHold) {
