@@ -12,13 +12,12 @@ namespace {
 // Most keys of a record are about no filter, and this is what they cost.
 [[gnu::always_inline]] inline size_t shapeOf(std::string_view key) {
   if (key.empty()) return 0;
-  const auto folded = [](char c) {
-    const auto byte = static_cast<unsigned char>(c);
-    return byte < 0x80 ? byte | 0x20u : 0x80u;  // no fold makes a character ASCII
-  };
-  const auto ends = static_cast<uint32_t>(key.size()) << 16 | folded(key.front()) << 8 | folded(key.back());
+  const auto byte = [](char c) { return uint32_t{static_cast<unsigned char>(c)}; };
+  uint32_t ends = byte(key.front()) << 8 | byte(key.back());
+  // A fold neither makes a character ASCII nor keeps one from being it; what it makes of others does not count.
+  ends = (ends & 0x8080u) == 0 ? ends | 0x2020u : 0;
   static_assert(EventFilters::kShapes == 256);
-  return (ends * 0x9E3779B1u) >> 24;
+  return ((static_cast<uint32_t>(key.size()) << 16 | ends) * 0x9E3779B1u) >> 24;
 }
 
 template <typename Matches>
@@ -77,11 +76,14 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   filters_.clear();
   filters_.reserve(filters.size());
   keyShapes_.reset();
+  asksMethod_ = asksStatus_ = false;
   for (const Value& element : filters) {
     Filter filter;
     if (const Dictionary* dictionary = element.dictionary()) {
       filter.method = intEntry(*dictionary, "method", -1);
       filter.status = intEntry(*dictionary, "status", -1);
+      asksMethod_ |= filter.method >= 0;
+      asksStatus_ |= filter.status >= 0;
       const Value* key = dictionary->find("key");
       if (key != nullptr && key->string() != nullptr) {
         filter.foldedKey = foldCase(*key->string());
@@ -108,25 +110,31 @@ EventFilters::Action EventFilters::actionForKey(std::string_view key, const Numb
 
 void EventFilters::filterEvent(Dictionary& event, Digest& digest) const {
   if (filters_.empty()) return;
-  // Read before any change, which none but a key of a filter's shape brings; a record without them counts as
-  // method 0 and status 0, deliberately.
   std::optional<Numbers> numbers;
   event.removeIf([&](const String& key, Value& value) {
-    if (!keyShapes_[shapeOf(key)]) return false;
-    if (!numbers) numbers = Numbers{intEntry(event, "_method", 0), intEntry(event, "_status", 0)};
-    switch (actionForKey(key, *numbers)) {
-      case Action::keep:
-        return false;
-      case Action::remove:
-        return true;
-      case Action::sha256:
-        break;
-    }
-    const std::optional<String> text = textToHash(value);
-    if (!text) return true;
-    value = Value(digest(*text));
-    return false;
+    return keyShapes_[shapeOf(key)] && mustRemove(event, key, value, numbers, digest);
   });
+}
+
+// Whether the entry is to be removed; hashes its value where that is asked for. `numbers` are read before any change,
+// which none but a key of a filter's shape brings; a record without them counts as method 0 and status 0, deliberately.
+[[gnu::noinline]] bool EventFilters::mustRemove(const Dictionary& event, const String& key, Value& value,
+                                                std::optional<Numbers>& numbers, Digest& digest) const {
+  if (!numbers)
+    numbers = Numbers{asksMethod_ ? intEntry(event, "_method", 0) : 0,
+                      asksStatus_ ? intEntry(event, "_status", 0) : 0};
+  switch (actionForKey(key, *numbers)) {
+    case Action::keep:
+      return false;
+    case Action::remove:
+      return true;
+    case Action::sha256:
+      break;
+  }
+  const std::optional<String> text = textToHash(value);
+  if (!text) return true;
+  value = Value(digest(*text));
+  return false;
 }
 
 }  // namespace kyt

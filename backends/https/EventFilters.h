@@ -50,9 +50,12 @@ class EventFilters {
     int32_t method, status;  // of the record
   };
   [[nodiscard]] Action actionForKey(std::string_view key, const Numbers& numbers) const;
+  [[nodiscard]] bool mustRemove(const Dictionary& event, const String& key, Value& value,
+                                std::optional<Numbers>& numbers, Digest& digest) const;
 
   std::vector<Filter> filters_;
-  std::bitset<kShapes> keyShapes_;  // those that the filters' keys have (EventFilters.cpp)
+  bool asksMethod_ = false, asksStatus_ = false;  // whether some filter is bound to one
+  std::bitset<kShapes> keyShapes_;                // those that the filters' keys have (EventFilters.cpp)
 };
 
 }  // namespace kyt
