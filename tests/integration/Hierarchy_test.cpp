@@ -4,6 +4,8 @@
 namespace kyt {
 namespace {
 
+constexpr double kBelowEveryDraw = -0.5;  // of a factor for sampling, which may be 0
+
 class Hierarchy : public HierarchyTest {
  protected:
   void SetUp() override {
@@ -111,9 +113,10 @@ TEST_F(Hierarchy, AParentThatDiesLeavesItsChildWithTheIdentifierThatItHad) {
 }
 
 TEST_F(Hierarchy, AChildGetsItsParentsStateAndSamplingThreshold) {
-  // Alone the child would be disabled: no factor is at most 0, and every factor is above the override's 0.
+  // Alone the child would be disabled: every factor is above the threshold and above the override.
   start({entryWith("top", {{"sampling_threshold", 1.5}}),
-         entryWith("child", {{"sampling_threshold", 0.0}, {"override_sampling", 0.0}})});
+         entryWith("child",
+                   {{"sampling_threshold", kBelowEveryDraw}, {"override_sampling", kBelowEveryDraw}})});
   {
     const Process alone = open("child", -1, 9, false, "live:");
     finish(*alone);
@@ -140,13 +143,13 @@ TEST_F(Hierarchy, AParentThatIsDisabledDisablesItsDescendants) {
 }
 
 TEST_F(Hierarchy, ASessionHeldBackBySamplingIsNotOverwritten) {
-  start({entry("top"), entryWith("held", {{"sampling_threshold", 0.0}})});
+  start({entry("top"), entryWith("held", {{"sampling_threshold", kBelowEveryDraw}})});
   const Process top = open("top", 0, 1), held = open("held", 1, 2);
   // Let go: what was held back comes, and the threshold is still its own.
   held->step(R"({"do":"send","category":10,"type":1,"flag":2,"payload":{}})");
   finish(*held);
   ASSERT_TRUE(arrive("client=held&method=0&status=1", 1)) << daemonLog();
-  EXPECT_EQ(textOf(records("held", 0, 1).at(0), "SamplingThreshold"), "0");
+  EXPECT_EQ(textOf(records("held", 0, 1).at(0), "SamplingThreshold"), "-0.5");
 }
 
 TEST_F(Hierarchy, AParentsNewStateReachesSessionsThatAreThere) {
