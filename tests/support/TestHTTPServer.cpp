@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <cerrno>
 #include <condition_variable>
 #include <csignal>
 #include <list>
@@ -217,6 +218,7 @@ class TestHTTPServer::Implementation {
   void acceptConnections() {
     for (;;) {
       const int accepted = accept4(listener_, nullptr, nullptr, SOCK_CLOEXEC);
+      if (accepted < 0 && (errno == EINTR || errno == ECONNABORTED)) continue;
       std::lock_guard lock(mutex_);
       if (stopping_ || accepted < 0) {
         if (accepted >= 0) close(accepted);

@@ -16,6 +16,7 @@
 #include <utility>
 #include <vector>
 
+#include "tests/support/Eventually.h"
 #include "tests/support/TestCertificates.h"
 
 namespace kyt {
@@ -83,12 +84,11 @@ class TestHTTPServer {
 
   [[nodiscard]] std::vector<Request> requests() const;
   [[nodiscard]] size_t requestCount() const;
-  [[nodiscard]] bool waitForRequests(size_t count,
-                                     std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
+  [[nodiscard]] bool waitForRequests(size_t count, std::chrono::milliseconds timeout = kTestDeadline) const;
   [[nodiscard]] size_t connectionsAccepted() const;
   [[nodiscard]] size_t connectionsOpen() const;
-  [[nodiscard]] bool waitForConnectionsOpen(
-      size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(10)) const;
+  [[nodiscard]] bool waitForConnectionsOpen(size_t count,
+                                            std::chrono::milliseconds timeout = kTestDeadline) const;
 
   void release();           // lets every held request be answered, now and later
   void closeConnections();  // cuts all connections; goes on listening

@@ -168,6 +168,7 @@ void URLNetwork::run() {
     epoll_event events[64];
     const int count = epoll_wait(epoll_, events, 64, deadlines_.millisecondsFrom(now_));
     now_ = currentTime();
+    sockets_.beginTurn();
     for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);
   }
   while (!sessions_.empty()) {

@@ -14,30 +14,36 @@ WatchedSockets::Watched& WatchedSockets::at(int socket) {
 }
 
 void WatchedSockets::opened(int socket) {
-  at(socket) = {nullptr, 0, true};
+  at(socket) = {nullptr, 0, turn_, true};
 }
 
 void WatchedSockets::closed(int socket) {
-  at(socket) = {};
+  at(socket) = {nullptr, 0, turn_, false};
 }
 
 URLConnectionPool* WatchedSockets::poolOf(int socket) {
   Watched& watched = at(socket);
-  if (watched.pool == nullptr && watched.events != 0) {
-    // The server closed an idle connection. libcurl finds that out when it looks at the connection again.
-    epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
-    watched.events = 0;
-  }
-  return watched.pool;
+  if (watched.pool != nullptr) return watched.pool;
+  // Of a socket that was left after the wait, this event may be the last sign: its number is not touched.
+  if (watched.left == turn_) return nullptr;
+  // It is open, then. The server closed an idle connection, which libcurl finds out when it looks at the
+  // connection again; or libcurl left it while more than input was watched.
+  epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
+  watched.events = 0;
+  return nullptr;
 }
 
 void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
   Watched& watched = at(socket);
   if (what == CURL_POLL_REMOVE) {
     watched.pool = nullptr;
+    watched.left = turn_;
     if (watched.ours && watched.events == EPOLLIN) return;
-    if (watched.events != 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, socket, nullptr);
+    // libcurl has closed a socket that was still connecting before it says so here, and tells nothing else of its
+    // end: the number may be another thread's by now. The kernel forgets a closed socket by itself, and an open
+    // one is seen to at its next event.
     watched.events = 0;
+    watched.ours = false;
     return;
   }
   const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
@@ -49,7 +55,7 @@ void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
   event.data.u64 = static_cast<uint64_t>(socket);
   const int operation = watched.events == 0 ? EPOLL_CTL_ADD : EPOLL_CTL_MOD;
   if (epoll_ctl(epoll_, operation, socket, &event) != 0) {
-    // A number that the resolver used again without telling: the kernel knows better.
+    // What was left open, or a number that the resolver used again without telling: the kernel knows better.
     const int other = errno == EEXIST ? EPOLL_CTL_MOD : EPOLL_CTL_ADD;
     if (epoll_ctl(epoll_, other, socket, &event) != 0) return;
   }

@@ -14,22 +14,27 @@ class URLConnectionPool;
 class WatchedSockets {
  public:
   void setEpoll(int descriptor) { epoll_ = descriptor; }
+  // After each wait for events, before they are handled.
+  void beginTurn() { ++turn_; }
   // A socket of ours: its end will be told.
   void opened(int socket);
   void closed(int socket);
   // As libcurl's socket callback says: CURL_POLL_IN, …_OUT, …_INOUT, …_REMOVE.
   void watch(URLConnectionPool& pool, int socket, int what);
-  // The pool that waits for an event of that socket, or null; then the socket is no longer watched.
+  // The pool that waits for an event of that socket, or null; then the socket is no longer watched, now or at its
+  // next event.
   [[nodiscard]] URLConnectionPool* poolOf(int socket);
 
  private:
   struct Watched {
     URLConnectionPool* pool = nullptr;  // null: nobody waits for it at the moment
-    uint32_t events = 0;                // that the kernel watches; 0: none
+    uint32_t events = 0;                // that the kernel watches; 0: none, or it is not known
+    uint32_t left = 0;                  // the turn in which it was closed, or nobody waited for it any more
     bool ours = false;
   };
   Watched& at(int socket);
   int epoll_ = -1;
+  uint32_t turn_ = 1;
   std::vector<Watched> sockets_;
 };
 

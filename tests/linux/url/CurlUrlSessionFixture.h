@@ -14,6 +14,7 @@
 #include "platform/Log.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/linux/url/CurlUrlSession.h"
+#include "tests/support/Eventually.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
@@ -34,7 +35,7 @@ class Outcome {
       state->changed.notify_all();
     };
   }
-  bool wait(std::chrono::milliseconds timeout = std::chrono::seconds(20)) const {
+  bool wait(std::chrono::milliseconds timeout = kTestDeadline) const {
     std::unique_lock lock(state_->mutex);
     return state_->changed.wait_until(lock, std::chrono::steady_clock::now() + timeout,
                                       [&] { return state_->calls > 0; });
@@ -74,17 +75,6 @@ class Outcome {
   };
   std::shared_ptr<State> state_ = std::make_shared<State>();
 };
-
-// Whether `condition` became true in time.
-template <typename Condition>
-bool eventually(Condition condition, std::chrono::milliseconds timeout = std::chrono::seconds(20)) {
-  const auto end = std::chrono::steady_clock::now() + timeout;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
 
 class CurlURLSessionFixture : public testing::Test {
  protected:
