@@ -10,8 +10,9 @@ namespace {
 using std::chrono::milliseconds;
 using Steady = std::chrono::steady_clock;
 
-constexpr milliseconds kLookInterval{1};  // while messages flow
-constexpr milliseconds kQuietAfter{20};   // no message for so long: sleep until woken
+constexpr milliseconds kLookInterval{1};      // while messages flow
+constexpr milliseconds kQuietAfter{20};       // no message for so long: sleep until woken
+constexpr milliseconds kUnwokenInterval{20};  // there was no descriptor left for the wake-up
 
 std::atomic<Loop*> currentLoop{nullptr};
 std::once_flag forkHandlersInstalled;
@@ -95,6 +96,7 @@ milliseconds Loop::timeout(const std::vector<std::shared_ptr<Session>>& sessions
     const auto left = std::max(std::chrono::ceil<milliseconds>(*deadline - now), milliseconds(0));
     if (timeout.count() < 0 || left < timeout) timeout = left;
   }
+  if (wakeUp_.fd() < 0 && (timeout.count() < 0 || timeout > kUnwokenInterval)) return kUnwokenInterval;
   return timeout;
 }
 
@@ -104,6 +106,8 @@ void Loop::run() {
   linux_client::WaitSet waits;
   SteadyTime lastActive = Steady::now();
   for (;;) {
+    std::vector<std::shared_ptr<Session>> former;  // those that end here run completions: without the lock
+    former.swap(sessions);
     {
       MutexLock lock(mutex_);
       std::erase_if(sessions_, [](const auto& session) { return session->isDone(); });
@@ -113,6 +117,7 @@ void Loop::run() {
         return;
       }
     }
+    former.clear();
     if (turn(sessions)) lastActive = Steady::now();
     bool active = Steady::now() - lastActive < kQuietAfter;
     if (!active) {

@@ -3,6 +3,7 @@
 #include <future>
 
 #include "kytreporting/kytreporting.h"
+#include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TemporaryFolder.h"
@@ -34,7 +35,7 @@ TEST(CInterface, RunsAWholeSession) {
         static_cast<std::promise<std::string>*>(context)->set_value(text);
       },
       &states);
-  EXPECT_EQ(states.get_future().get(), "httppost qrs ");
+  EXPECT_EQ(answerOf(states), "httppost qrs ");
 
   kyt_dictionary* payload = kyt_dictionary_new();
   kyt_dictionary_set_string(payload, "text", "value");
@@ -51,7 +52,7 @@ TEST(CInterface, RunsAWholeSession) {
         static_cast<std::promise<std::string>*>(context)->set_value(error != nullptr ? error : "");
       },
       &flushed);
-  EXPECT_EQ(flushed.get_future().get(), "Nothing to flush");
+  EXPECT_EQ(answerOf(flushed), "Nothing to flush");
   EXPECT_EQ(kyt_session_finish(session, 20000), 1);
   kyt_statistics figures{};
   kyt_session_statistics(session, &figures);
@@ -78,18 +79,18 @@ TEST(CInterface, AsksForAnswersUploadsAndLogData) {
   };
   std::promise<std::string> posted, url;
   kyt_session_send_with_reply(session, 1, 2, nullptr, 0, keepText, &posted);
-  EXPECT_EQ(posted.get_future().get(), "posted");
+  EXPECT_EQ(answerOf(posted), "posted");
   kyt_session_fetch_display_url(session, keepText, &url);
-  EXPECT_EQ(url.get_future().get(), "https://display");
+  EXPECT_EQ(answerOf(url), "https://display");
 
   const kyt_success_callback keepSuccess = [](int success, const char*, void* context) {
     static_cast<std::promise<int>*>(context)->set_value(success);
   };
   std::promise<int> uploaded, missing, logged;
   kyt_session_upload_file(session, folder.write("report.log", "content").c_str(), keepSuccess, &uploaded);
-  EXPECT_EQ(uploaded.get_future().get(), 1);
+  EXPECT_EQ(answerOf(uploaded), 1);
   kyt_session_upload_file(session, (folder / "missing").c_str(), keepSuccess, &missing);
-  EXPECT_EQ(missing.get_future().get(), 0);
+  EXPECT_EQ(answerOf(missing), 0);
   kyt_array* entries = kyt_array_new();
   kyt_array_append_string(entries, "line");
   kyt_array_append_int(entries, 2);
@@ -98,7 +99,7 @@ TEST(CInterface, AsksForAnswersUploadsAndLogData) {
   EXPECT_EQ(kyt_array_count(entries), 4u);
   kyt_session_upload_log_data(session, entries, keepSuccess, &logged);
   kyt_array_free(entries);
-  EXPECT_EQ(logged.get_future().get(), 0);
+  EXPECT_EQ(answerOf(logged), 0);
   EXPECT_EQ(daemon.count("LogData 4"), 1u);
   EXPECT_EQ(daemon.count("Upload file://"), 1u);
   kyt_session_close(session);
@@ -124,7 +125,7 @@ TEST(CInterface, ReceivesAggregatedMessages) {
   kyt_session* session = kyt_session_open(&options);
   ASSERT_TRUE(eventually([&] { return daemon.count("SetSessionInfo") == 1; }));
   daemon.sendToClient(Dictionary{{"SessionID", 7}}, 12.5, 3, 4, Dictionary{{"k", "v"}});
-  EXPECT_EQ(received.get_future().get(), "7 12.500000 3 4 v");
+  EXPECT_EQ(answerOf(received), "7 12.500000 3 4 v");
   kyt_session_close(session);
 }
 

@@ -1,6 +1,8 @@
 #include "kytreporting/KYTReporting.h"
 
 #include <gtest/gtest.h>
+#include <pthread.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -8,6 +10,7 @@
 #include <future>
 #include <thread>
 
+#include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TemporaryFolder.h"
@@ -32,7 +35,7 @@ class KYTReportingTest : public testing::Test {
         for (const std::string& name : *states) text += name + " ";
       answer.set_value(text);
     });
-    return answer.get_future().get();
+    return answerOf(answer);
   }
 
   TemporaryFolder folder_;
@@ -90,7 +93,7 @@ TEST_F(KYTReportingTest, ReplaysIdentityConfigurationSharedDataAndDigestKeyToADa
   session->setDigestKey(Data("key"), 3);
   std::promise<void> fetched;
   session->fetchStates(Dictionary{{"ClientName", "later"}}, [&](auto, auto) { fetched.set_value(); });
-  fetched.get_future().wait();
+  answerOf(fetched);
   daemon_.stop();
   const size_t before = daemon_.calls().size();
   ASSERT_TRUE(daemon_.start());
@@ -160,18 +163,18 @@ TEST_F(KYTReportingTest, GivesTheAnswersOfTheDaemonToTheCompletions) {
   const auto session = KYTReporting::open(options());
   std::promise<Value> posted;
   session->sendMessage(1, 1, {}, 0, [&](Value answer, auto) { posted.set_value(std::move(answer)); });
-  EXPECT_EQ(posted.get_future().get(), Value("posted"));
+  EXPECT_EQ(answerOf(posted), Value("posted"));
   std::promise<std::optional<Error>> flushed;
   session->flush([&](const Value&, std::optional<Error> error) { flushed.set_value(std::move(error)); });
-  const auto error = flushed.get_future().get();
+  const auto error = answerOf(flushed);
   ASSERT_TRUE(error);
   EXPECT_EQ(*error, (Error{"SomeDomain", -1, "Nothing to flush"}));
   std::promise<std::string> url;
   session->fetchDisplayURL([&](std::string text, auto) { url.set_value(std::move(text)); });
-  EXPECT_EQ(url.get_future().get(), "https://display");
+  EXPECT_EQ(answerOf(url), "https://display");
   std::promise<bool> log;
   session->uploadLogData(Array{1, 2}, [&](bool success, auto) { log.set_value(success); });
-  EXPECT_FALSE(log.get_future().get());
+  EXPECT_FALSE(answerOf(log));
   EXPECT_EQ(daemon_.count("LogData 2"), 1u);
 }
 
@@ -181,7 +184,7 @@ TEST_F(KYTReportingTest, PassesAFileAndItsFolderAsDescriptors) {
   const auto session = KYTReporting::open(options());
   std::promise<bool> done;
   session->uploadFile(file, [&](bool success, auto) { done.set_value(success); });
-  EXPECT_TRUE(done.get_future().get());
+  EXPECT_TRUE(answerOf(done));
   EXPECT_EQ(daemon_.count("Upload file://" + folder_.path() + "/a%20report.log with descriptors"), 1u);
 }
 
@@ -204,7 +207,7 @@ TEST_F(KYTReportingTest, GivesAnErrorToCompletionsWhoseConnectionEnds) {
   session->flush([&](const Value&, std::optional<Error> error) { flushed.set_value(std::move(error)); });
   ASSERT_TRUE(eventually([&] { return daemon_.count("Flush") == 1; }));
   daemon_.stop();
-  const auto error = flushed.get_future().get();
+  const auto error = answerOf(flushed);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain, kKYTReportingClientErrorDomain);
 }
@@ -238,7 +241,7 @@ TEST_F(KYTReportingTest, MayBeClosedFromInsideItsOwnCompletion) {
     session.reset();
     closed.set_value();
   });
-  closed.get_future().wait();
+  answerOf(closed);
   EXPECT_EQ(session, nullptr);
 }
 
@@ -250,7 +253,7 @@ TEST_F(KYTReportingTest, RefusesWhatIsSentAfterItSaidGoodbye) {
   EXPECT_EQ(session->statistics().droppedClosed, 1u);
   std::promise<std::optional<Error>> flushed;
   session->flush([&](const Value&, std::optional<Error> error) { flushed.set_value(std::move(error)); });
-  EXPECT_TRUE(flushed.get_future().get());
+  EXPECT_TRUE(answerOf(flushed));
 }
 
 TEST_F(KYTReportingTest, GoodbyeWithoutADaemonGivesUpAfterItsTime) {
@@ -292,7 +295,7 @@ TEST_F(KYTReportingTest, SendsASingleMessageOnAConnectionOfItsOwn) {
   std::promise<std::string> done;
   KYTReporting::sendSingleMessage(options(), 5, 6, Dictionary{{"a", 1}},
                                   [&](std::string text, auto) { done.set_value(std::move(text)); });
-  EXPECT_EQ(done.get_future().get(), "finished");
+  EXPECT_EQ(answerOf(done), "finished");
   EXPECT_EQ(daemon_.calls(), (std::vector<std::string>{"Single 5 6"}));
 }
 
@@ -301,7 +304,20 @@ TEST_F(KYTReportingTest, ASingleMessageWithoutADaemonFails) {
   KYTReporting::sendSingleMessage(options(), 5, 6, std::nullopt, [&](auto, std::optional<Error> error) {
     done.set_value(std::move(error));
   });
-  EXPECT_TRUE(done.get_future().get());
+  EXPECT_TRUE(answerOf(done));
+}
+
+// Each of these ends the library's thread, which may be over before the call that started it.
+TEST_F(KYTReportingTest, EveryThreadOfTheLibraryHasItsNameFromTheBeginning) {
+  for (int i = 0; i < 300; ++i) {
+    std::promise<std::string> named;
+    KYTReporting::sendSingleMessage(options(), 5, 6, std::nullopt, [&](auto, auto) {
+      char name[16] = {};
+      pthread_getname_np(pthread_self(), name, sizeof name);
+      named.set_value(name);
+    });
+    ASSERT_EQ(answerOf(named), "kytreporting") << i;
+  }
 }
 
 TEST_F(KYTReportingTest, TakesMessagesFromManyThreadsAtOnceAndLosesNone) {
@@ -348,6 +364,31 @@ TEST_F(KYTReportingTest, IsInertInAForkedChildWhichMayOpenSessionsOfItsOwn) {
   EXPECT_EQ(daemon_.count("Send 9"), 0u);
   EXPECT_EQ(daemon_.count("Send 8"), 1u);
   EXPECT_EQ(daemon_.count("Send 1"), 1u);
+}
+
+// The library's first session, in a program that has no descriptor left just then.
+TEST_F(KYTReportingTest, WorksOnWhenThereWasNoDescriptorForItsWakeUp) {
+  ASSERT_TRUE(daemon_.start());
+  const pid_t child = fork();
+  if (child == 0) {
+    alarm(static_cast<unsigned>(kTestDeadline.count()));
+    rlimit before{};
+    getrlimit(RLIMIT_NOFILE, &before);
+    rlimit none = before;
+    none.rlim_cur = 0;
+    setrlimit(RLIMIT_NOFILE, &none);
+    const auto session = KYTReporting::open(options());
+    setrlimit(RLIMIT_NOFILE, &before);
+    bool right = statesOf(*session) == "httppost qrs ";
+    for (int i = 0; i < 3; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(50));  // the library's thread sleeps after 20
+      right = right && statesOf(*session) == "httppost qrs ";
+    }
+    _exit(right ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
 }
 #endif
 

@@ -1,6 +1,8 @@
 #include "tests/client/TestDaemon.h"
 
-#include <thread>
+#include <gtest/gtest.h>
+
+#include "tests/support/Eventually.h"
 
 namespace kyt {
 
@@ -107,7 +109,7 @@ void TestDaemon::stop() {
       record->heldFlushes.clear();
     }
   }
-  while (server_->connectionCount() > 0) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  EXPECT_TRUE(eventually([this] { return server_->connectionCount() == 0; }));
   server_.reset();
   pool_->shutDown();
   reactor_->stop();

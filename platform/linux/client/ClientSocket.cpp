@@ -130,10 +130,11 @@ uint32_t effectiveUser() {
 
 bool startThread(const char* name, void (*run)(void*), void* argument) {
   struct Start {
+    const char* name;
     void (*run)(void*);
     void* argument;
   };
-  auto* start = new Start{run, argument};
+  auto* start = new Start{name, run, argument};
   sigset_t all, before;
   sigfillset(&all);
   pthread_sigmask(SIG_SETMASK, &all, &before);
@@ -147,11 +148,12 @@ bool startThread(const char* name, void (*run)(void*), void* argument) {
       [](void* given) -> void* {
         const Start copy = *static_cast<Start*>(given);
         delete static_cast<Start*>(given);
+        // Its own work: it may have ended, and nobody joins it, before whoever starts it could name it.
+        pthread_setname_np(pthread_self(), copy.name);
         copy.run(copy.argument);
         return nullptr;
       },
       start);
-  if (result == 0) pthread_setname_np(thread, name);
   pthread_attr_destroy(&attributes);
   pthread_sigmask(SIG_SETMASK, &before, nullptr);
   if (result != 0) delete start;

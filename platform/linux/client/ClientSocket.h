@@ -67,7 +67,7 @@ class WaitSet {
 };
 
 [[nodiscard]] uint32_t effectiveUser();
-// Starts a detached thread of that name in which no signal of the program is handled.
+// Starts a detached thread of that name (a literal) in which no signal of the program is handled.
 bool startThread(const char* name, void (*run)(void*), void* argument);
 // Registered once for the process.
 void atFork(void (*prepare)(), void (*parent)(), void (*child)());
