@@ -18,6 +18,7 @@ namespace {
 
 constexpr uint64_t kWake = ~uint64_t{0};
 constexpr uint64_t kRoutes = kWake - 1;  // as in UrlNetworkWaiting.cpp
+constexpr Duration kRefusedPause = std::chrono::milliseconds(10);
 constexpr Duration kStopPatience = std::chrono::seconds(5);
 
 MonotonicTime currentTime() {
@@ -88,15 +89,28 @@ void URLNetwork::wakeUp() {
 }
 
 void URLNetwork::submit(Command command) {
-  MutexLock lock(mutex_);
-  if (stopping_) return;
-  commands_.push_back(std::move(command));
-  if (running_) {
-    if (commands_.size() == 1) eventfd_write(wake_, 1);
-    return;
+  {
+    MutexLock lock(mutex_);
+    if (stopping_) return;
+    commands_.push_back(std::move(command));
+    if (running_) {
+      if (commands_.size() == 1) eventfd_write(wake_, 1);
+      return;
+    }
+    if (startThread()) return;
   }
-  if (!startThread())
-    log_.error("CurlURLSession(start): cannot start the network thread, the request is delayed");
+  insistOnTheThread();
+}
+
+// Without the thread nothing would end the request, not even its time-out, and whoever waits for it may hold what all
+// others need. Better that the caller waits until the system gives what it has refused.
+void URLNetwork::insistOnTheThread() {
+  log_.error("CurlURLSession(start): cannot start the network thread, the request is delayed");
+  for (;;) {
+    std::this_thread::sleep_for(kRefusedPause);
+    MutexLock lock(mutex_);
+    if (stopping_ || running_ || startThread()) return;
+  }
 }
 
 bool URLNetwork::startThread() {
@@ -106,7 +120,7 @@ bool URLNetwork::startThread() {
   try {
     thread_ = std::thread([this] { run(); });
     running_ = true;
-  } catch (const std::system_error&) {  // too many threads: the next command tries again
+  } catch (const std::system_error&) {  // too many threads
   }
   return running_;
 }

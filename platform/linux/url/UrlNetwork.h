@@ -97,6 +97,7 @@ class URLNetwork {
   enum class Which : uint8_t { all, awaited };
 
   void submit(Command command);
+  void insistOnTheThread();
   void wakeUp();
   [[nodiscard]] bool startThread() REQUIRES(mutex_);
   void run();

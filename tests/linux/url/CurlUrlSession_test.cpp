@@ -1,12 +1,17 @@
 #include <curl/curl.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <set>
+#include <system_error>
 
 #include "platform/Limits.h"
+#include "platform/Semaphore.h"
 #include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/support/Sanitizers.h"
 
 namespace kyt {
 namespace {
@@ -268,6 +273,38 @@ TEST_F(CurlURLSession, SendsARequestWithoutACompletion) {
   EXPECT_TRUE(server_.waitForRequests(1));
   EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
   EXPECT_EQ(factory().figures().completed, 1u);
+}
+
+// A system that refuses a thread for a while. Nobody else starts a request, so nobody else would try again.
+TEST_F(CurlURLSession, ARequestThatFoundNoThreadIsSentAsSoonAsThereIsOne) {
+  if (kSanitized) GTEST_SKIP() << "a sanitizer takes more address space than any limit";
+  auto urls = session();
+  rlimit before{};
+  ASSERT_EQ(getrlimit(RLIMIT_AS, &before), 0);
+  std::thread relief([&] {
+    EXPECT_TRUE(eventually([&] { return sink_.count("cannot start the network thread") > 0; }));
+    setrlimit(RLIMIT_AS, &before);
+  });
+  URLRequest request = get(server_.url("/"));
+  Outcome outcome;
+  Semaphore over;
+  std::vector<std::thread> others;  // take what stacks the library has kept
+  others.reserve(64);
+  size_t pages = 0;
+  std::ifstream("/proc/self/statm") >> pages;
+  rlimit tight = before;
+  tight.rlim_cur = pages * static_cast<size_t>(getpagesize()) + (6u << 20);  // less than a thread's stack
+  ASSERT_EQ(setrlimit(RLIMIT_AS, &tight), 0);
+  try {
+    while (others.size() < 64) others.emplace_back([&] { over.wait(); });
+  } catch (const std::system_error&) {
+  }
+  urls->start(std::move(request), outcome.completion());
+  relief.join();
+  EXPECT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  for (size_t i = 0; i < others.size(); ++i) over.signal();
+  for (std::thread& other : others) other.join();
 }
 
 TEST_F(CurlURLSession, RequestsOverTheMostAtOnceWaitInLine) {
