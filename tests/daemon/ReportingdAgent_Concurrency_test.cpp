@@ -97,7 +97,7 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
   drain.join();
   EXPECT_EQ(answered, kThreads * kRounds);
   EXPECT_EQ(agent.sessionCount(), 0U);
-  EXPECT_TRUE(agent.waitUntilSessionsHaveEnded(std::chrono::seconds(10)));
+  EXPECT_TRUE(agent.waitUntilSessionsHaveEnded(std::chrono::seconds(30)));
   EXPECT_FALSE(transaction_.outOfOrder());
 }
 

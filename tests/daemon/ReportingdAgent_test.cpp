@@ -104,7 +104,7 @@ TEST_F(AgentConnections, ShutDownRefusesNewConnectionsAndFinishesTheOthers) {
   EXPECT_FALSE(agent_.waitUntilSessionsHaveEnded(Duration(0)));
   agent_.finishAllSessions();
   test_.executor.runAll();
-  EXPECT_TRUE(agent_.waitUntilSessionsHaveEnded(std::chrono::seconds(10)));
+  EXPECT_TRUE(agent_.waitUntilSessionsHaveEnded(std::chrono::seconds(30)));
   EXPECT_TRUE(client.connection->invalidated());
   EXPECT_EQ(factory_.latest("httppost")->cleanupCount, 1);
   EXPECT_FALSE(connect());

@@ -167,7 +167,7 @@ TEST_F(Connectivity, WhatStillWaitsIsGivenUpWhenTheDaemonEnds) {
   const auto begin = std::chrono::steady_clock::now();
   daemon_->terminate();
   EXPECT_EQ(daemon_->exitStatus(), 0);
-  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(5));
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(20)) << "it would wait for ever";
   EXPECT_TRUE(daemon_->logged("shutDown: Cancelling 1 requests that have not been answered in time"))
       << daemon_->log();
   started_ = false;

@@ -144,9 +144,7 @@ TEST_F(WholeSystem, SendsEverySessionsStopMessageAndBatchWhenItIsTerminated) {
     EXPECT_EQ(clients.back()->displayURL(), "https://display.example.org/");
   }
   EXPECT_EQ(arrived("client=ending"), 0) << "nothing has been flushed so far";
-  const auto begin = std::chrono::steady_clock::now();
   EXPECT_EQ(stage_->stopDaemon().value_or(-1), 0) << daemonLog();
-  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(5)) << "the grace time";
   EXPECT_EQ(arrived("client=ending&method=9"), kSessions);
   EXPECT_EQ(arrived("client=ending&method=0&status=0"), kSessions);
   EXPECT_EQ(arrived("client=ending&method=0&status=1"), kSessions);
