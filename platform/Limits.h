@@ -38,6 +38,7 @@ struct Limits {
   // Requests on their way at once, all sessions; further ones wait in line. Each has a connection of some 45 KiB and a
   // descriptor, and clients that come and go start them faster than servers answer.
   static constexpr size_t maxActiveRequests = 1024;
+  static constexpr size_t maxActiveRequestsToOneServer = 512;  // one that does not answer must not stop the others
   static constexpr size_t maxWorkers = 512;           // threads
   static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
   static constexpr double handshakeSeconds = 30;

@@ -39,6 +39,7 @@ struct CurlURLSessionOptions {
   Duration idleConnectionTime = std::chrono::seconds(30);  // then a session's connections close
   size_t maxIdlePools = 512;                               // sessions with idle connections: descriptors
   size_t maxActiveRequests = Limits::maxActiveRequests;
+  size_t maxActiveRequestsToOneServer = Limits::maxActiveRequestsToOneServer;
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events
   std::string sysClassNet = "/sys/class/net";
   std::string resolverFile = "/etc/resolv.conf";

@@ -49,6 +49,7 @@ URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counte
       idlePools_(options_.maxIdlePools),
       routes_(options_.cellularInterfaces, options_.sysClassNet, options_.resolverFile),
       certificates_(options_.certificateFile),
+      lines_(options_.maxActiveRequests, options_.maxActiveRequestsToOneServer),
       settle_(
           deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->retryWaiting(false); }, this),
       slowRetry_(
@@ -276,10 +277,8 @@ void URLNetwork::refuse(URLTransfer& transfer) {
 }
 
 void URLNetwork::activate(URLTransfer& transfer) {
-  // One with an end of its own (a storebag's) has no time to wait, and there are few of them.
-  if (active_ >= options_.maxActiveRequests && !transfer.request.timeout) {
+  if (!lines_.mayGo(transfer)) {
     transfer.phase = URLTransfer::Phase::inLine;
-    line_.push_back(transfer.self);
     return;
   }
   std::unique_ptr<URLConnectionPool>& pool =
@@ -290,21 +289,17 @@ void URLNetwork::activate(URLTransfer& transfer) {
   transfer.lastProgress = now_;
   const CURLcode code = pool->add(transfer);
   if (code != CURLE_OK) {
+    lines_.hasGone(transfer);
     pool->closeIfIdle();
     fail(transfer, code, curl_->easyErrorText(code));
     return;
   }
   transfer.phase = URLTransfer::Phase::active;
-  ++active_;
   armDeadline(transfer);
 }
 
 void URLNetwork::activateNextInLine() {
-  while (active_ < options_.maxActiveRequests && !line_.empty()) {
-    const std::shared_ptr<URLTransfer> next = std::move(line_.front());
-    line_.pop_front();
-    if (next->phase == URLTransfer::Phase::inLine) activate(*next);
-  }
+  while (const std::shared_ptr<URLTransfer> next = lines_.next()) activate(*next);
 }
 
 void URLNetwork::armDeadline(URLTransfer& transfer) {
@@ -350,7 +345,7 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
 }
 
 void URLNetwork::withdraw(URLTransfer& transfer) {
-  if (transfer.phase == URLTransfer::Phase::active) --active_;
+  if (transfer.phase == URLTransfer::Phase::active) lines_.hasGone(transfer);
   if (transfer.handle != nullptr)
     transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1]->remove(transfer);
   if (transfer.phase == URLTransfer::Phase::waiting) stopWaiting(transfer);

@@ -9,7 +9,6 @@
 
 #include <atomic>
 #include <condition_variable>
-#include <deque>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -22,6 +21,7 @@
 #include "platform/linux/url/CurlLibrary.h"
 #include "platform/linux/url/CurlUrlSession.h"
 #include "platform/linux/url/DeadlineHeap.h"
+#include "platform/linux/url/RequestLines.h"
 #include "platform/linux/url/RouteEvents.h"
 #include "platform/linux/url/RouteTable.h"
 #include "platform/linux/url/UrlSessionState.h"
@@ -159,9 +159,7 @@ class URLNetwork {
   WatchedSockets sockets_;
   std::vector<Command> taken_;
   bool awaitedGone_ = false;  // those there were when they were cancelled; later ones are refused
-  size_t active_ = 0;
-  std::deque<std::shared_ptr<URLTransfer>>
-      line_;                              // those among them that are in line no more are passed over
+  RequestLines lines_;
   LinkedList<URLSessionState> sessions_;  // that have requests or connections
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
   Deadline slowRetry_;

@@ -338,6 +338,36 @@ TEST_F(CurlURLSession, RequestsOverTheMostAtOnceWaitInLine) {
   EXPECT_EQ(server_.requestCount(), 5u);
 }
 
+TEST_F(CurlURLSession, AServerThatDoesNotAnswerLeavesRoomForTheOthers) {
+  options_.maxActiveRequests = 3;
+  options_.maxActiveRequestsToOneServer = 2;
+  server_.setReply(reply(Behaviour::hold));
+  TestHTTPServer other, third;
+  third.setReply(reply(Behaviour::hold));
+  std::vector<std::unique_ptr<URLSession>> sessions(9);
+  for (auto& one : sessions) one = session();
+  std::vector<Outcome> outcomes(9);
+  for (size_t i = 0; i < 5; ++i) sessions[i]->start(get(server_.url("/")), outcomes[i].completion());
+  ASSERT_TRUE(server_.waitForRequests(2));
+  sessions[5]->start(get(other.url("/")), outcomes[5].completion());
+  ASSERT_TRUE(outcomes[5].wait());
+  EXPECT_EQ(outcomes[5].status(), 200);
+  // All are taken; when one gets free, it is the turn of the server that has none.
+  sessions[6]->start(get(third.url("/")), outcomes[6].completion());
+  ASSERT_TRUE(third.waitForRequests(1));
+  sessions[7]->start(get(third.url("/")), outcomes[7].completion());
+  sessions[8]->start(get(other.url("/")), outcomes[8].completion());
+  third.release();
+  ASSERT_TRUE(outcomes[8].wait());
+  EXPECT_EQ(outcomes[8].status(), 200);
+  EXPECT_EQ(server_.requestCount(), 2u);
+  server_.release();
+  for (const size_t i : {0, 1, 2, 3, 4, 6, 7}) {
+    ASSERT_TRUE(outcomes[i].wait()) << i;
+    EXPECT_EQ(outcomes[i].status(), 200) << i;
+  }
+}
+
 TEST_F(CurlURLSession, WhatWaitsInLineEndsWithTheShutDown) {
   options_.maxActiveRequests = 1;
   server_.setReply(reply(Behaviour::hold));
