@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/WorkerPool.h"
 #include "platform/linux/system/Files.h"
 
 namespace kyt {
@@ -39,11 +40,13 @@ std::string operationSymbol(std::string_view className, std::string_view operati
   return name;
 }
 
+// Each call into a plug-in is announced as a wait: it may block, and that is to hold up its own session alone.
 class LoadedObject final : public PluginObject {
  public:
   LoadedObject(void* library, std::string className, void* self)
       : library_(library), class_(std::move(className)), self_(self) {}
   ~LoadedObject() override {
+    const BlockingScope blocking;
     if (const auto end = symbol<Delete>(library_, class_ + "_delete")) end(self_);
   }
   LoadedObject(const LoadedObject&) = delete;
@@ -56,10 +59,12 @@ class LoadedObject final : public PluginObject {
               const Dictionary& dictionary) override {
     const std::string json = kyt::description(Value(dictionary));
     const PluginDictionary view = {json.c_str(), json.size()};
+    const BlockingScope blocking;
     if (const Operation call = find(operation)) call(self_, method, respCode, &view);
   }
   [[nodiscard]] std::string description() const override {
     const auto describe = symbol<Describe>(library_, class_ + "_description");
+    const BlockingScope blocking;
     const char* text = describe != nullptr ? describe(self_) : nullptr;
     return text != nullptr ? text : "<" + class_ + ">";
   }
@@ -85,6 +90,7 @@ class LoadedClass final : public PluginClass {
   LoadedClass(void* library, std::string name, New make)
       : library_(library), name_(std::move(name)), make_(make) {}
   [[nodiscard]] std::unique_ptr<PluginObject> newInstance() override {
+    const BlockingScope blocking;
     void* self = make_();
     if (self == nullptr) return nullptr;
     return std::make_unique<LoadedObject>(library_, name_, self);

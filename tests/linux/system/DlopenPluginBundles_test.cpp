@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <string>
 
+#include "platform/WorkerPool.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -104,6 +105,29 @@ TEST_F(PluginTest, CallsAnObjectsOperationByItsName) {
   EXPECT_EQ(kept.length, std::string(kept.json).size());
   object.reset();
   EXPECT_EQ(kept.objects, 0);
+}
+
+TEST_F(PluginTest, EachCallIsAnnouncedAsAWait) {
+  struct Observer final : BlockingObserver {
+    void willBlock() override { ++waits; }
+    void hasBlocked() override { ++ends; }
+    int waits = 0, ends = 0;
+  } observer;
+  install();
+  const auto bundle = bundles_.bundleWithPath(kBundle);
+  ASSERT_TRUE(bundle->load());
+  const auto adaptor = bundle->classNamed("QDXAdaptor");
+  BlockingObserver* const former = BlockingObserver::exchange(&observer);
+  auto object = adaptor->newInstance();
+  EXPECT_EQ(observer.waits, 1);
+  object->invoke(kOperation, 1, 2, {});
+  EXPECT_EQ(observer.waits, 2);
+  EXPECT_EQ(object->description(), "the test's adaptor");
+  EXPECT_EQ(observer.waits, 3);
+  object.reset();
+  EXPECT_EQ(observer.waits, 4);
+  EXPECT_EQ(observer.ends, 4);
+  BlockingObserver::exchange(former);
 }
 
 TEST_F(PluginTest, WhatAClassLeavesOutIsMadeUpFor) {
