@@ -1,6 +1,7 @@
 #include "backends/dashboard/DashboardBackend.h"
 
 #include <algorithm>
+#include <array>
 #include <cstdio>
 #include <new>
 #include <vector>
@@ -18,6 +19,7 @@ constexpr Duration kDefaultPeriod = std::chrono::milliseconds(500);
 constexpr int32_t kShortestPeriod = 10;  // milliseconds; a shorter one would only keep the daemon awake
 constexpr Duration kLeeway = std::chrono::milliseconds(100);
 constexpr size_t kMaxAddressText = 16;
+constexpr int kMostThatCameEarlier = 1024;  // more than a socket holds
 
 const String* textOf(const Dictionary& profile, const char* key) {
   const Value* value = profile.find(key);
@@ -124,9 +126,18 @@ bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std
     platform_.log.error("DashboardBackend(initWithName): socket connect() failed.");
     return false;
   }
+  forgetWhatCameEarlier();
   if (startTimer()) return true;
   platform_.log.error("DashboardBackend(initWithName): can't create timer source.");
   return false;
+}
+
+// What came to the port before it was connected may be anybody's, and name events that are yet to be sent.
+void DashboardBackend::forgetWhatCameEarlier() {
+  if (!reliableUDP_) return;
+  std::array<std::byte, DashboardDatagram::kSize> buffer;
+  for (int i = 0; i < kMostThatCameEarlier && socket_->receive(buffer) >= 0; ++i) {
+  }
 }
 
 void DashboardBackend::readProfile(const Dictionary& profile) {

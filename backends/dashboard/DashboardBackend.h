@@ -95,6 +95,7 @@ class DashboardBackend : public KYTReportingBackend {
   // The making after the socket is open, on the network queue; false after a failure, which is logged.
   [[nodiscard]] bool start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
                            uint16_t serverPort);
+  void forgetWhatCameEarlier();
   void readProfile(const Dictionary& profile);
   void useReliableUDP();
   [[nodiscard]] DashboardDatagram::Header headerFor(const TimeValue& timestamp, uint16_t method,

@@ -94,6 +94,18 @@ TEST_F(Dashboard, ListensOnAfterADatagramThatCameWhileItWasMade) {
   EXPECT_TRUE(queued().empty());
 }
 
+TEST_F(Dashboard, ForgetsWhatCameBeforeItWasConnected) {
+  platform_.reactor.whenWatched = [this](int) {
+    platform_.udpSockets.last().arriving.assign(3, std::string(61, '\0') + '\7');
+  };
+  ASSERT_NE(make(reliable()), nullptr);
+  EXPECT_TRUE(socket().arriving.empty());
+  send(7);
+  EXPECT_EQ(queued().size(), 1u);
+  EXPECT_TRUE(acknowledge(7));
+  EXPECT_TRUE(queued().empty());
+}
+
 TEST_F(Dashboard, TakesThePortFromTextAndKeepsItsLow16Bits) {
   ASSERT_NE(make(Dictionary{{"ip", "192.0.2.7"}, {"port", "4001"}}), nullptr);
   EXPECT_EQ(socket().port, 4001);
