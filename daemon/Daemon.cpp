@@ -88,8 +88,8 @@ std::unique_ptr<ProgramInspector> programInspector(Log& log) {
 
 // Files that were uploaded are removed by a process outside the confinement, which alone may take its clients'
 // users; without it they stay.
-std::unique_ptr<DeletionBroker> deletionBroker(Log& log) {
-  auto started = DeletionBroker::start();
+std::unique_ptr<DeletionBroker> deletionBroker(const LinuxConfinement& confinement, Log& log) {
+  auto started = DeletionBroker::start(confinement.openPaths(kServiceName));
   if (const auto* error = std::get_if<std::string>(&started)) {
     log.error("main: Cannot remove files that were uploaded: %s", error->c_str());
     return nullptr;
@@ -156,9 +156,9 @@ int runDaemon(const DaemonOptions& options) {
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
   StopSignals stopSignals;
   log.normal("startLogging: Daemon starts logging...");
-  const std::unique_ptr<DeletionBroker> broker = deletionBroker(log);
-  const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   LinuxConfinement confinement = confinementOf(paths, settings);
+  const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
+  const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   if (const auto error = confine(confinement)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;

@@ -12,6 +12,7 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <optional>
 #include <string>
@@ -139,6 +140,20 @@ TEST_F(UploadAttacks, AnotherFoldersFileOfThatNameStays) {
   EXPECT_EQ(received("a"), "mine");
   EXPECT_EQ(elsewhere.read("a"), "another");
   EXPECT_EQ(files_.read("a"), "mine");
+}
+
+// Where the daemon can open files itself: who took it over must not remove them in the name of a client.
+TEST_F(UploadAttacks, AFileInTheDaemonsOwnFoldersStays) {
+  for (const char* place : {"/etc/kytreportingd", "/var/lib/kytreportingd/defaults"}) {
+    const std::string path = stage_->folder() + place + "/a.log";
+    std::ofstream(path) << "mine";
+    const Descriptor file = opened(path), folder = opened(stage_->folder() + place, O_PATH | O_DIRECTORY);
+    EXPECT_EQ(client_->upload(path, {file.get(), folder.get()}), "yes");
+    EXPECT_TRUE(eventually([&] {
+      return logged("LinuxFileExtensions(remove): Cannot remove a.log: Operation not permitted");
+    })) << daemonLog();
+    EXPECT_TRUE(exists(path));
+  }
 }
 
 // The path of a call is a name and nothing more: another file's name does not make it that file.

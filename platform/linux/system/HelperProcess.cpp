@@ -6,6 +6,7 @@
 #include <sys/syscall.h>
 #include <sys/time.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -25,8 +26,8 @@ void leaveTheDaemon(const char* name, int socket) {
 
 }  // namespace
 
-std::variant<std::unique_ptr<HelperProcess>, std::string> HelperProcess::start(const char* name,
-                                                                               void (*serve)(int)) {
+std::variant<std::unique_ptr<HelperProcess>, std::string> HelperProcess::start(
+    const char* name, const std::function<void(int)>& serve) {
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
     return "socketpair: " + errorText(errno);
@@ -46,8 +47,13 @@ std::variant<std::unique_ptr<HelperProcess>, std::string> HelperProcess::start(c
 
 HelperProcess::~HelperProcess() {
   { const FileHandle closed = std::move(socket_); }
-  int status = 0;
-  while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
+  // Somebody may have stopped it, and the confined daemon cannot end it.
+  constexpr int kLooks = 400;  // four seconds
+  constexpr timespec kPause = {0, 10'000'000};
+  for (int look = 0; look < kLooks; ++look) {
+    const pid_t ended = ::waitpid(child_, nullptr, WNOHANG);
+    if (ended == child_ || (ended < 0 && errno != EINTR)) return;
+    ::nanosleep(&kPause, nullptr);
   }
 }
 

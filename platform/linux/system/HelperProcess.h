@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <string>
 #include <utility>
@@ -17,9 +18,9 @@ class HelperProcess {
  public:
   // Runs `serve` in a new process called `name`, with its end of the socket; `serve` does not return and, as it runs in
   // a forked process, allocates nothing and takes no lock. An error's text when it cannot be started.
-  [[nodiscard]] static std::variant<std::unique_ptr<HelperProcess>, std::string> start(const char* name,
-                                                                                       void (*serve)(int));
-  ~HelperProcess();  // closes the socket, which ends the process, and waits for it
+  [[nodiscard]] static std::variant<std::unique_ptr<HelperProcess>, std::string> start(
+      const char* name, const std::function<void(int)>& serve);
+  ~HelperProcess();  // closes the socket, which ends the process, and waits for it, some seconds at most
   HelperProcess(const HelperProcess&) = delete;
   HelperProcess& operator=(const HelperProcess&) = delete;
 

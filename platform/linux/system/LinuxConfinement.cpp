@@ -91,11 +91,25 @@ uint64_t LinuxConfinement::descriptorLimit() {
   return ::getrlimit(RLIMIT_NOFILE, &now) == 0 ? now.rlim_cur : 0;
 }
 
-std::optional<std::string> LinuxConfinement::enter(std::string_view profileName) {
+std::variant<ConfinementProfile, TomlError> LinuxConfinement::read(std::string_view profileName) const {
   const std::string file = folder_ + "/" + std::string(profileName) + ".profile";
   auto text = readTomlText(file);
-  if (const auto* error = std::get_if<TomlError>(&text)) return error->text;
-  auto parsed = parseProfile(std::get<std::string>(text), file, variables_);
+  if (auto* error = std::get_if<TomlError>(&text)) return std::move(*error);
+  return parseProfile(std::get<std::string>(text), file, variables_);
+}
+
+std::vector<std::string> LinuxConfinement::openPaths(std::string_view profileName) const {
+  const auto parsed = read(profileName);
+  const auto* profile = std::get_if<ConfinementProfile>(&parsed);
+  if (profile == nullptr) return {};
+  std::vector<std::string> paths = profile->read;
+  paths.insert(paths.end(), profile->write.begin(), profile->write.end());
+  paths.insert(paths.end(), profile->sockets.begin(), profile->sockets.end());
+  return paths;
+}
+
+std::optional<std::string> LinuxConfinement::enter(std::string_view profileName) {
+  auto parsed = read(profileName);
   if (const auto* error = std::get_if<TomlError>(&parsed)) return error->text;
   auto& profile = std::get<ConfinementProfile>(parsed);
   if (kSanitized) allowSanitizer(profile.systemCalls);

@@ -10,6 +10,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <variant>
 #include <vector>
 
 #include "platform/System.h"
@@ -25,6 +26,9 @@ class LinuxConfinement final : public Confinement {
   [[nodiscard]] std::optional<std::string> enter(std::string_view profileName) override;
   [[nodiscard]] std::optional<std::string> endStart() override;
 
+  // Where a process that has entered the profile can open files by itself; empty where the profile cannot be read, and
+  // then not be entered.
+  [[nodiscard]] std::vector<std::string> openPaths(std::string_view profileName) const;
   // What the profile asks and this kernel cannot do, known once entered; each ends "this kernel cannot …".
   [[nodiscard]] const std::vector<std::string>& notEnforced() const { return notEnforced_; }
   // Of this process, as the profile and what it was started with allow.
@@ -35,6 +39,7 @@ class LinuxConfinement final : public Confinement {
   [[nodiscard]] static bool limitsAddressSpace();
 
  private:
+  [[nodiscard]] std::variant<ConfinementProfile, TomlError> read(std::string_view profileName) const;
   const std::string folder_;
   const ProfileVariables variables_;
   SystemCallProfile systemCalls_;

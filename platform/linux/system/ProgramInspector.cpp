@@ -9,17 +9,21 @@
 #include <cerrno>
 #include <cstdio>
 
+#include "platform/WorkerPool.h"
 #include "platform/linux/system/Capabilities.h"
 
 namespace kyt {
-namespace {
 
-struct Answer {
+struct ProgramAnswer {
   int32_t error = 0;
-  int32_t pid = 0;  // of the question, so that an answer that came too late is not taken for another's
+  int32_t pid = 0;  // of the question
   ProgramIdentity program;
   char path[256] = "";
 };
+
+namespace {
+
+using Answer = ProgramAnswer;
 
 // Nothing here allocates or takes a lock: it runs in a forked process.
 Answer inspect(int32_t pid) {
@@ -64,19 +68,16 @@ void serve(int socket) {
   }
 }
 
-// In the daemon.
-Answer ask(int socket, int32_t pid) {
-  Answer failed;
-  failed.error = EIO;
-  if (::send(socket, &pid, sizeof pid, MSG_NOSIGNAL) != sizeof pid) return failed;
-  while (true) {
-    Answer answer;
-    const ssize_t count = ::recv(socket, &answer, sizeof answer, 0);
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0 && errno == EAGAIN) failed.error = ETIMEDOUT;
-    if (count != sizeof answer) return failed;
-    if (answer.pid == pid) return answer;
-  }
+// In the daemon. One answer, or why there is none.
+Answer receiveAnswer(int socket, int flags) {
+  Answer answer, failed;
+  ssize_t count = 0;
+  do {
+    count = ::recv(socket, &answer, sizeof answer, flags);
+  } while (count < 0 && errno == EINTR);
+  if (count == sizeof answer) return answer;
+  failed.error = count < 0 && errno == EAGAIN ? ETIMEDOUT : EIO;
+  return failed;
 }
 
 std::variant<ProgramIdentity, int> resultOf(const Answer& answer) {
@@ -101,14 +102,28 @@ std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspe
       new ProgramInspectorProcess(std::get<std::unique_ptr<HelperProcess>>(std::move(process))));
 }
 
+Answer ProgramInspectorProcess::ask(int32_t pid) {
+  const BlockingScope blocking;
+  const MutexLock lock(mutex_);
+  Answer failed;
+  failed.error = ETIMEDOUT;
+  // Each question has one answer, in order. While those of earlier ones are missing the helper stands still; who waited
+  // for it would only make the next wait too.
+  for (; unanswered_ != 0; --unanswered_)
+    if (receiveAnswer(process_->socket(), MSG_DONTWAIT).error == ETIMEDOUT) return failed;
+  failed.error = EIO;
+  if (::send(process_->socket(), &pid, sizeof pid, MSG_NOSIGNAL) != sizeof pid) return failed;
+  const Answer answer = receiveAnswer(process_->socket(), 0);
+  if (answer.error == ETIMEDOUT) ++unanswered_;
+  return answer.pid == pid || answer.error != 0 ? answer : failed;  // never another's
+}
+
 std::variant<ProgramIdentity, int> ProgramInspectorProcess::runningProgram(int32_t pid) {
-  MutexLock lock(mutex_);
-  return resultOf(ask(process_->socket(), pid));
+  return resultOf(ask(pid));
 }
 
 std::string ProgramInspectorProcess::programPath(int32_t pid) {
-  MutexLock lock(mutex_);
-  return ask(process_->socket(), pid).path;
+  return ask(pid).path;
 }
 
 }  // namespace kyt

@@ -40,19 +40,24 @@ class DirectProgramInspector final : public ProgramInspector {
   [[nodiscard]] std::string programPath(int32_t pid) override;
 };
 
+struct ProgramAnswer;
+
 class ProgramInspectorProcess final : public ProgramInspector {
  public:
   // Only before there are threads and before the confinement. An error's text when it cannot be started.
   [[nodiscard]] static std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> start();
-  // Waits for the answer, two seconds at most.
+  // Waits for the answer, two seconds at most. One that stands still is waited for once: until it has answered that
+  // question all others fail at once (ETIMEDOUT).
   [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(mutex_);
   [[nodiscard]] std::string programPath(int32_t pid) override EXCLUDES(mutex_);
 
  private:
   explicit ProgramInspectorProcess(std::unique_ptr<HelperProcess> process) : process_(std::move(process)) {}
+  [[nodiscard]] ProgramAnswer ask(int32_t pid) EXCLUDES(mutex_);
 
   Mutex mutex_;
   const std::unique_ptr<HelperProcess> process_ PT_GUARDED_BY(mutex_);
+  unsigned unanswered_ GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace kyt

@@ -30,7 +30,7 @@ constexpr uint64_t kPlenty = 1 << 20;
 class FileExtensionTest : public testing::Test {
  protected:
   static std::unique_ptr<DeletionBroker> startBroker() {
-    auto started = DeletionBroker::start();
+    auto started = DeletionBroker::start({});
     if (const auto* error = std::get_if<std::string>(&started)) ADD_FAILURE() << *error;
     return std::move(std::get<std::unique_ptr<DeletionBroker>>(started));
   }

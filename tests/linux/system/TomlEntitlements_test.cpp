@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <fstream>
 #include <regex>
 #include <string>
@@ -18,6 +19,7 @@
 #include "platform/Keys.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/Eventually.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -370,6 +372,27 @@ TEST(ProgramInspectorProcess, AnswersLikeAskingDirectly) {
   EXPECT_EQ(std::get<int>(inspector.runningProgram(0)), ESRCH);
   EXPECT_EQ(std::get<int>(inspector.runningProgram(-5)), ESRCH);
   EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ESRCH);
+}
+
+TEST(ProgramInspectorProcess, ThatStandsStillIsWaitedForOnceAndAnswersWhenItGoesOn) {
+  using Clock = std::chrono::steady_clock;
+  auto started = ProgramInspectorProcess::start();
+  ASSERT_EQ(started.index(), 0u);
+  ProgramInspector& inspector = *std::get<0>(started);
+  EXPECT_EQ(inspector.runningProgram(::getpid()).index(), 0u);
+  pid_t process = 0;
+  std::ifstream("/proc/thread-self/children") >> process;
+  ASSERT_GT(process, 0);
+  for (int round = 0; round < 2; ++round) {
+    ASSERT_EQ(::kill(process, SIGSTOP), 0);
+    EXPECT_EQ(std::get<int>(inspector.runningProgram(::getpid())), ETIMEDOUT);
+    const auto begin = Clock::now();
+    for (int i = 0; i < 100; ++i) EXPECT_EQ(std::get<int>(inspector.runningProgram(::getpid())), ETIMEDOUT);
+    EXPECT_LT(Clock::now() - begin, std::chrono::seconds(20)) << "each waited";
+    ASSERT_EQ(::kill(process, SIGCONT), 0);
+    EXPECT_TRUE(eventually([&] { return inspector.runningProgram(::getpid()).index() == 0; }));
+    EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ESRCH) << "the answer of another question";
+  }
 }
 
 }  // namespace
