@@ -134,6 +134,7 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
 }  // namespace
 
 int runDaemon(const DaemonOptions& options) {
+  fillStandardDescriptors();
   StderrSink standardError;
   Log log(standardError, options.logLevel);
   const Paths paths = Paths::of(absolutePath(options.root), executableFolder());

@@ -1,5 +1,6 @@
 #include "platform/linux/system/Process.h"
 
+#include <fcntl.h>
 #include <malloc.h>
 #include <unistd.h>
 
@@ -7,6 +8,12 @@
 #include <system_error>
 
 namespace kyt {
+
+void fillStandardDescriptors() {
+  int opened = ::open("/dev/null", O_RDWR);
+  while (opened >= 0 && opened <= STDERR_FILENO) opened = ::open("/dev/null", O_RDWR);
+  if (opened > STDERR_FILENO) ::close(opened);
+}
 
 std::string executableFolder() {
   std::error_code error;

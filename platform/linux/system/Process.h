@@ -6,6 +6,9 @@
 
 namespace kyt {
 
+// Opens the null device in the place of standard input, output and error that are closed: what is opened later would
+// take their numbers, and lines for people would be written into it.
+void fillStandardDescriptors();
 // The folder of the running program, absolute; empty when the system does not tell.
 [[nodiscard]] std::string executableFolder();
 // The path made absolute against the current folder; empty stays empty.
