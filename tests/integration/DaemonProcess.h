@@ -17,6 +17,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/Value.h"
@@ -126,8 +127,12 @@ class DaemonProcess {
     return ::waitid(P_PID, static_cast<id_t>(child_), &state, WEXITED | WNOHANG | WNOWAIT) != 0 ||
            state.si_pid == child_;
   }
-  // Waits for the end. -1: ended by a signal.
+  // Waits for the end, which is brought about after two minutes. -1: ended by a signal.
   [[nodiscard]] int exitStatus() {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(2);
+    while (!hasEnded() && std::chrono::steady_clock::now() < deadline)
+      std::this_thread::sleep_for(std::chrono::microseconds(200));
+    if (!hasEnded()) ::kill(child_, SIGKILL);
     int status = 0;
     while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
     }

@@ -83,8 +83,9 @@ class ScriptedClient {
   std::vector<std::string> end() {
     ::shutdown(pipe_, SHUT_WR);
     std::vector<std::string> lines;
-    for (std::string text = line(); text != "(the end)" && text != "(nothing)"; text = line())
-      lines.push_back(std::move(text));
+    std::string text = line();
+    for (; text != "(the end)" && text != "(nothing)"; text = line()) lines.push_back(std::move(text));
+    if (text == "(nothing)") ::kill(pid_, SIGKILL);  // it hangs
     lines.push_back("status " + std::to_string(wait()));
     return lines;
   }
