@@ -443,7 +443,7 @@ TEST_F(ForgedRequest, ThatIsWholeIsServed) {
 
 TEST_F(ForgedRequest, WithTheWrongDescriptorsIsDroppedAndLeavesNoneOpen) {
   EXPECT_EQ(ask({}), 0);  // it has finished starting
-  const auto descriptors = [this] {
+  const auto descriptors = [] {
     return std::distance(
         std::filesystem::directory_iterator("/proc/" + std::to_string(brokerProcess()) + "/fd"), {});
   };
