@@ -86,6 +86,17 @@ std::variant<EntitlementGrants, TomlError> parseEntitlements(std::string_view te
   return result;
 }
 
+namespace {
+
+// In a folder that others can write they could otherwise link a grant of root's that is not meant to count.
+bool isLinkOfOthers(const std::string& path, std::optional<uint32_t> trustedUser) {
+  struct stat status = {};
+  return ::lstat(path.c_str(), &status) == 0 && S_ISLNK(status.st_mode) && status.st_uid != 0 &&
+         status.st_uid != trustedUser;
+}
+
+}  // namespace
+
 EntitlementsFile readEntitlementsFile(const std::string& path, std::optional<uint32_t> trustedUser) {
   EntitlementsFile result;
   result.path = path;
@@ -99,7 +110,7 @@ EntitlementsFile readEntitlementsFile(const std::string& path, std::optional<uin
   const auto& file = std::get<FileContents>(contents);
   result.identity = file.identity;
   const bool trustedOwner = file.identity.owner == 0 || file.identity.owner == trustedUser;
-  if (!trustedOwner || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0) {
+  if (!trustedOwner || isLinkOfOthers(path, trustedUser) || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0) {
     result.ignored = true;
     result.problems.push_back(tomlError(path, 0, "others than root can write the file. It is ignored"));
     return result;

@@ -153,6 +153,20 @@ TEST_F(TomlEntitlementsTest, AFileOfAnotherOwnerIsIgnored) {
       << "the user of a private root may own its files";
 }
 
+TEST_F(TomlEntitlementsTest, ALinkThatOthersMadeIsIgnoredWithALine) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give links away";
+  grant("user = 5\n", "meant.disabled");
+  std::filesystem::create_symlink("meant.disabled", folder_ / "a.toml");
+  EXPECT_TRUE(isGranted(peer(5))) << "root's own link counts";
+  std::filesystem::remove(folder_ / "a.toml");
+  const std::string link = folder_ / "b.toml";
+  std::filesystem::create_symlink("meant.disabled", link);
+  ASSERT_EQ(::lchown(link.c_str(), 54321, 54321), 0);
+  EXPECT_FALSE(isGranted(peer(5)));
+  EXPECT_EQ(sink_.count(LogLevel::error, "entitlements: " + link + ": others than root can write the file"),
+            1u);
+}
+
 TEST_F(TomlEntitlementsTest, WhatIsWrongCountsForNothingAndIsToldOnce) {
   const std::pair<std::string, std::string> bad[] = {
       {kGranted, ":1: a grant without user, group, executable and security_label is ignored"},
