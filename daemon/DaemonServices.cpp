@@ -160,7 +160,9 @@ bool DaemonServices::shutDown() {
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
     listener_.invalidateConnections();
   // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes.
-  const bool threadsEnd = workers_.shutDownWithin(deadline.left() + kCancelGrace);
+  const bool workersEnd = workers_.shutDownWithin(deadline.left() + kCancelGrace);
+  // Completions write to the message log and more that is destroyed before the URL sessions are.
+  const bool threadsEnd = urlSessions_.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
   if (threadsEnd)
     reactor_->stop();
   else

@@ -41,6 +41,10 @@ CurlURLSessionFactory::~CurlURLSessionFactory() {
   network_->stop();
 }
 
+bool CurlURLSessionFactory::shutDownWithin(Duration patience) {
+  return network_->stopWithin(patience);
+}
+
 std::unique_ptr<URLSession> CurlURLSessionFactory::create(URLSessionConfiguration configuration) {
   return std::make_unique<CurlURLSession>(
       std::make_shared<URLSessionState>(network_, std::move(configuration)));

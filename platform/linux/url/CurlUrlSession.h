@@ -52,6 +52,10 @@ class CurlURLSessionFactory final : public URLSessionFactory {
   // threads. Sessions may outlive it and then start nothing. Not from a completion.
   ~CurlURLSessionFactory() override;
 
+  // The same before the end, for an owner whose completions use what is destroyed earlier than this. False when they
+  // still run after `patience`. Once, not from a completion; nothing starts afterwards.
+  [[nodiscard]] bool shutDownWithin(Duration patience);
+
   [[nodiscard]] std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) override;
   void cancelAwaited() override;
   void cancelAll() override;

@@ -126,7 +126,8 @@ bool URLNetwork::startThread() {
   return running_;
 }
 
-void URLNetwork::stop() {
+bool URLNetwork::stopWithin(Duration patience) {
+  const auto end = std::chrono::steady_clock::now() + patience;
   std::thread thread;
   cancelAll();
   {
@@ -135,12 +136,17 @@ void URLNetwork::stop() {
     thread = std::move(thread_);
     if (running_) eventfd_write(wake_, 1);
   }
-  if (!thread.joinable()) return;
+  if (!thread.joinable()) return true;
   thread.join();
   {
     std::unique_lock lock(mutex_.native());
-    (void)allDelivered_.wait_for(lock, kStopPatience, [&] { return outstanding_.load() == 0; });
+    (void)allDelivered_.wait_until(lock, end, [&] { return outstanding_.load() == 0; });
   }
+  return !workers_ || workers_->shutDownWithin(end - std::chrono::steady_clock::now());
+}
+
+void URLNetwork::stop() {
+  static_cast<void>(stopWithin(kStopPatience));
   if (workers_) workers_->shutDown();
 }
 

@@ -67,7 +67,10 @@ class URLNetwork {
   void invalidate(std::shared_ptr<URLSessionState> session);
   void cancelAwaited();
   void cancelAll();
-  void stop();  // once, not from a thread of this network
+  // Cancels what is left, and ends the threads; false when completions still run after `patience`. Once, not from a
+  // thread of this network.
+  [[nodiscard]] bool stopWithin(Duration patience);
+  void stop();  // the same, however long it takes, also after the other
   void completionHasRun();
   [[nodiscard]] URLFigures figures() const;
   [[nodiscard]] size_t outstanding() const { return outstanding_.load(); }

@@ -2,6 +2,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
@@ -543,6 +544,39 @@ TEST_F(CurlURLSession, ReportsARefusedConnectionAtOnceEvenIfItWaitsForConnectivi
   EXPECT_EQ(outcome.errorCode(), CURLE_COULDNT_CONNECT);
   EXPECT_FALSE(outcome.errorText().empty());
   EXPECT_EQ(factory().figures().waiting, 0u);
+}
+
+// What completions use may be gone before the factory is.
+TEST_F(CurlURLSession, SaysAtItsEndWhetherCompletionsStillRun) {
+  Semaphore running, goOn;
+  std::atomic<bool> over = false;
+  auto urls = session();
+  static_cast<void>(urls->start(get(server_.url("/")), [&](auto&&...) {
+    running.signal();
+    EXPECT_TRUE(goOn.waitFor(kTestDeadline));
+    over = true;
+  }));
+  ASSERT_TRUE(running.waitFor(kTestDeadline));
+  EXPECT_FALSE(factory().shutDownWithin(50ms));
+  goOn.signal();
+  factory_.reset();
+  EXPECT_TRUE(over);
+}
+
+TEST_F(CurlURLSession, WaitsAtItsEndForCompletionsThatStillRun) {
+  Semaphore running, goOn;
+  std::atomic<bool> over = false;
+  auto urls = session();
+  static_cast<void>(urls->start(get(server_.url("/")), [&](auto&&...) {
+    running.signal();
+    EXPECT_TRUE(goOn.waitFor(kTestDeadline));
+    over = true;
+  }));
+  ASSERT_TRUE(running.waitFor(kTestDeadline));
+  std::thread later([&] { goOn.signal(); });
+  EXPECT_TRUE(factory().shutDownWithin(kTestDeadline));
+  EXPECT_TRUE(over);
+  later.join();
 }
 
 TEST_F(CurlURLSession, SpeaksHTTPAlone) {
