@@ -546,36 +546,34 @@ TEST_F(CurlURLSession, ReportsARefusedConnectionAtOnceEvenIfItWaitsForConnectivi
   EXPECT_EQ(factory().figures().waiting, 0u);
 }
 
-// What completions use may be gone before the factory is.
-TEST_F(CurlURLSession, SaysAtItsEndWhetherCompletionsStillRun) {
-  Semaphore running, goOn;
-  std::atomic<bool> over = false;
-  auto urls = session();
-  static_cast<void>(urls->start(get(server_.url("/")), [&](auto&&...) {
-    running.signal();
-    EXPECT_TRUE(goOn.waitFor(kTestDeadline));
-    over = true;
-  }));
-  ASSERT_TRUE(running.waitFor(kTestDeadline));
+// A completion that has begun and goes on when it is told to. What completions use may be gone before the factory is.
+class CurlURLSessionEnd : public CurlURLSession {
+ protected:
+  void SetUp() override {
+    urls_ = session();
+    static_cast<void>(urls_->start(get(server_.url("/")), [this](auto&&...) {
+      running_.signal();
+      EXPECT_TRUE(goOn_.waitFor(kTestDeadline));
+      over_ = true;
+    }));
+    ASSERT_TRUE(running_.waitFor(kTestDeadline));
+  }
+  Semaphore running_, goOn_;
+  std::atomic<bool> over_ = false;
+  std::unique_ptr<URLSession> urls_;
+};
+
+TEST_F(CurlURLSessionEnd, SaysWhetherCompletionsStillRun) {
   EXPECT_FALSE(factory().shutDownWithin(50ms));
-  goOn.signal();
+  goOn_.signal();
   factory_.reset();
-  EXPECT_TRUE(over);
+  EXPECT_TRUE(over_);
 }
 
-TEST_F(CurlURLSession, WaitsAtItsEndForCompletionsThatStillRun) {
-  Semaphore running, goOn;
-  std::atomic<bool> over = false;
-  auto urls = session();
-  static_cast<void>(urls->start(get(server_.url("/")), [&](auto&&...) {
-    running.signal();
-    EXPECT_TRUE(goOn.waitFor(kTestDeadline));
-    over = true;
-  }));
-  ASSERT_TRUE(running.waitFor(kTestDeadline));
-  std::thread later([&] { goOn.signal(); });
+TEST_F(CurlURLSessionEnd, WaitsForCompletionsThatStillRun) {
+  std::thread later([this] { goOn_.signal(); });
   EXPECT_TRUE(factory().shutDownWithin(kTestDeadline));
-  EXPECT_TRUE(over);
+  EXPECT_TRUE(over_);
   later.join();
 }
 
