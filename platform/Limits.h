@@ -38,9 +38,9 @@ struct Limits {
   // Requests on their way at once, all sessions; further ones wait in line. Each has a connection of some 45 KiB and a
   // descriptor, and clients that come and go start them faster than servers answer.
   static constexpr size_t maxActiveRequests = 1024;
-  static constexpr size_t maxActiveRequestsToOneServer = 512;  // one that does not answer must not stop the others
-  static constexpr size_t maxWorkers = 512;           // threads
-  static constexpr size_t maxHandshakeBytes = 16384;  // before authentication
+  static constexpr size_t maxActiveRequestsToOneServer = 512;  // one without answers leaves others room
+  static constexpr size_t maxWorkers = 512;                    // threads
+  static constexpr size_t maxHandshakeBytes = 16384;           // before authentication
   static constexpr double handshakeSeconds = 30;
   static constexpr size_t maxDescriptorsPerMessage = 16;
   static constexpr unsigned turnCalls = 256;        // a connection hands its worker back after so many calls
