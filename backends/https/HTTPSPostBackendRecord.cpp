@@ -124,8 +124,7 @@ Dictionary HTTPSPostBackend::makeRecord(Dictionary payload, const TimeValue& tim
   writer.setWhenKnown(keys.build, buildVersion_);
   writer.set(keys.internal, configuration_.deviceIdentity.isInternalBuild() ? 1u : 0u);
   writer.set(keys.reportVers, reportVersion());
-  // The event's time is now: messages are stamped when they come, and the clock is not free.
-  writer.set(keys.timezoneOffset, platform_.deviceProperties.secondsFromGMT(timestamp));
+  writer.set(keys.timezoneOffset, platform_.deviceProperties.secondsFromGMT(platform_.clock.timeOfDay()));
   return record;
 }
 

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <atomic>
+#include <limits>
 #include <map>
 #include <optional>
 #include <string>
@@ -28,6 +29,11 @@ class FakeDeviceProperties final : public DeviceProperties {
     country_ = std::move(country);
   }
   void setSecondsFromGMT(int64_t seconds) { secondsFromGMT_ = seconds; }
+  // From that second on, as where the clocks are put forward.
+  void changeSecondsFromGMT(int64_t from, int64_t seconds) {
+    later_ = seconds;
+    laterFrom_ = from;
+  }
   // How often that property was asked for.
   [[nodiscard]] int queries(std::string_view key) const EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
@@ -47,14 +53,17 @@ class FakeDeviceProperties final : public DeviceProperties {
     if (!country_) return std::nullopt;
     return String(std::string_view(*country_));
   }
-  [[nodiscard]] int64_t secondsFromGMT(TimeValue) override { return secondsFromGMT_; }
+  [[nodiscard]] int64_t secondsFromGMT(TimeValue time) override {
+    return time.seconds >= laterFrom_ ? later_ : secondsFromGMT_;
+  }
 
  private:
   mutable Mutex mutex_;
   std::map<std::string, std::string> properties_ GUARDED_BY(mutex_);
   std::map<std::string, int> queries_ GUARDED_BY(mutex_);
   std::optional<std::string> country_ GUARDED_BY(mutex_);
-  std::atomic<int64_t> secondsFromGMT_ = 0;
+  std::atomic<int64_t> secondsFromGMT_ = 0, later_ = 0;
+  std::atomic<int64_t> laterFrom_ = std::numeric_limits<int64_t>::max();
 };
 
 }  // namespace kyt

@@ -1,10 +1,10 @@
 // Finds the first message in a stream's bytes and checks its header. Used by the daemon's server on each
 // connection's large reads and by the client library on what the daemon answers.
 //
-// No allocation, no state between calls but what a HeaderMemory holds, any thread. The bytes are hostile; a message is looked at in
-// place, at any address, in either byte order. Everything in the header is checked: field types and padding,
-// required fields, names, paths, signatures, lengths against the limit before anything else is believed. The
-// body is checked by BodyReader, or by validateBody.
+// No allocation, no state between calls but what a HeaderMemory holds, any thread. The bytes are hostile; a
+// message is looked at in place, at any address, in either byte order. Everything in the header is checked:
+// field types and padding, required fields, names, paths, signatures, lengths against the limit before anything
+// else is believed. The body is checked by BodyReader, or by validateBody.
 #pragma once
 
 #include <cstddef>

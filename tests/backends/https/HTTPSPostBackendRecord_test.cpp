@@ -22,6 +22,13 @@ class HTTPSPostBackendRecord : public HTTPSFixture {
   }
 };
 
+TEST_F(HTTPSPostBackendRecord, HasTheOffsetOfTheTimeAtWhichItIsMade) {
+  const int64_t now = platform_.clock.timeOfDay().seconds;
+  platform_.deviceProperties.setSecondsFromGMT(3600);
+  platform_.deviceProperties.changeSecondsFromGMT(now, 7200);
+  EXPECT_EQ(entryOf(record({}, {now - 1, 0}), "_timezoneOffset"), Value(7200));
+}
+
 TEST_F(HTTPSPostBackendRecord, HoldsThePayloadAndTheFixedKeysInOrder) {
   platform_.deviceProperties.setSecondsFromGMT(-3600);
   backend().setCombinedSessionIDString(String("12.77"));
