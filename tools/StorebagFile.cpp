@@ -94,6 +94,22 @@ void warnAboutFilters(const Dictionary& client, const std::string& where, std::v
   }
 }
 
+// A session may meet one entry after another, as its user information changes.
+void warnAboutWhatStays(const Array& clients, const std::string& where, std::vector<std::string>& out) {
+  for (const char* key : {"expedite", "custom_clientId", "override_sampling"}) {
+    size_t entries = 0, having = 0;
+    for (const Value& element : clients) {
+      const Dictionary* client = element.dictionary();
+      if (client == nullptr) continue;
+      ++entries;
+      if (client->contains(key)) ++having;
+    }
+    if (having != 0 && having != entries)
+      out.push_back(where + ": only some clients have \"" + key +
+                    "\": a session that goes on from one of these to another may keep what the first said");
+  }
+}
+
 void warnAboutClients(const Dictionary& backend, const std::string& where, std::vector<std::string>& out) {
   const Value* clients = backend.find("clients");
   if (clients == nullptr || clients->array() == nullptr) {
@@ -119,6 +135,7 @@ void warnAboutClients(const Dictionary& backend, const std::string& where, std::
                     ": no \"event_threshold\": it is 0, and nearly every batched event flushes the batch");
     warnAboutFilters(*client, at, out);
   }
+  warnAboutWhatStays(*clients->array(), where, out);
 }
 
 }  // namespace

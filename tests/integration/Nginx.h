@@ -25,8 +25,9 @@ class Nginx {
  public:
   static bool isHere() { return isInstalled("nginx"); }
 
-  // The lifetimes: "brisca" 0 seconds, "emrit" 1 second, all others an hour. "fosska" drips.
-  explicit Nginx(const TestCertificate& certificate) {
+  // The lifetimes: "brisca" 0 seconds, "emrit" 1 second, all others an hour. "fosska" drips. `locations` joins what
+  // the server answers.
+  explicit Nginx(const TestCertificate& certificate, const std::string& locations = {}) {
     folder_.write("certificate.pem", certificate.certificatePEM);
     folder_.write("key.pem", certificate.keyPEM, 0600);
     std::filesystem::create_directories(storebags());
@@ -40,7 +41,7 @@ class Nginx {
         ::getsockname(listening, reinterpret_cast<sockaddr*>(&address), &size) != 0)
       std::abort();
     port_ = ntohs(address.sin_port);
-    folder_.write("nginx.conf", configuration());
+    folder_.write("nginx.conf", configuration(locations));
     tools::ChildProcess::Options how;
     how.outputFile = folder_ / "output";
     how.environment = {{"NGINX", std::to_string(listening) + ";"},
@@ -80,7 +81,7 @@ class Nginx {
 
  private:
   [[nodiscard]] std::string storebags() const { return folder_ / "www/storebags/tolvar"; }
-  [[nodiscard]] std::string configuration() const {
+  [[nodiscard]] std::string configuration(const std::string& locations) const {
     // With a socket handed over nginx needs its master process; its worker would leave root otherwise.
     std::string text = ::geteuid() == 0 ? "user root;\n" : "";
     text +=
@@ -98,8 +99,8 @@ class Nginx {
         "    listen 127.0.0.1:PORT ssl http2;\n"
         "    ssl_certificate FOLDER/certificate.pem;\n    ssl_certificate_key FOLDER/key.pem;\n"
         "    root FOLDER/www;\n"
-        "    location ~ /fosska$ { limit_rate 100; }\n"
-        "  }\n}\n";
+        "    location ~ /fosska$ { limit_rate 100; }\n" +
+        locations + "  }\n}\n";
     const auto replaceAll = [&text](const std::string& what, const std::string& by) {
       for (size_t at = 0; (at = text.find(what, at)) != std::string::npos; at += by.size())
         text.replace(at, what.size(), by);

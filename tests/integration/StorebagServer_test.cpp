@@ -89,6 +89,13 @@ TEST_F(StorebagServer, AnswersUnchangedAfterTheLifetimeAndThenWithTheChangedBag)
   EXPECT_EQ(nginx_->accesses()[3].find("GET /storebags/tolvar/brisca 304 "), 0U) << nginx_->accesses()[3];
 }
 
+TEST_F(StorebagServer, TakesABagThatIsPutBackWithItsOlderTime) {
+  nginx_->put("brisca", bag("httppost2", "2"), 5);
+  EXPECT_EQ(configured(kBrisca), "live: httppost2") << context();
+  nginx_->put("brisca", bag("httppost"), 10);
+  EXPECT_EQ(configured(kBrisca), "live: httppost") << context();
+}
+
 TEST_F(StorebagServer, IsAskedAgainWhenTheLifetimeIsOver) {
   nginx_->put("emrit", bag("httppost"), 10);
   const auto begin = std::chrono::system_clock::now();

@@ -315,5 +315,22 @@ TEST_F(Kytctl, WarnsAboutWhatMaySurprise) {
   }
 }
 
+TEST_F(Kytctl, WarnsWhereEntriesDifferInWhatStaysInForce) {
+  makeKeys();
+  const auto shown = [&](const std::string& first, const std::string& second) {
+    const std::string bag = folder_.write(
+        "bag.json", R"({"version":"1","release":{"qrs":{"clients":[{)" + first + "},{" + second + "}]}}}");
+    EXPECT_EQ(sign(bag, folder_ / "document").status, 0);
+    return run({"storebag", "show", folder_ / "document"}).text;
+  };
+  for (const char* key : {"expedite", "custom_clientId", "override_sampling"}) {
+    const std::string entry = "\"" + std::string(key) + "\":1",
+                      warning = "only some clients have \"" + std::string(key);
+    EXPECT_TRUE(has(shown(entry, ""), "warning: release/qrs: " + warning)) << key;
+    EXPECT_FALSE(has(shown(entry, entry), warning)) << key;
+    EXPECT_FALSE(has(shown("", ""), warning)) << key;
+  }
+}
+
 }  // namespace
 }  // namespace kyt

@@ -221,6 +221,16 @@ TEST_F(HTTPSPostBackendState, DeviceListsAdmitFamiliesAndExcludeModels) {
   EXPECT_EQ(decide(), kBackendStateEnabled);
 }
 
+TEST_F(HTTPSPostBackendState, AListThatRefusesTheDeviceDoesNotGoOnToTheNextEntry) {
+  for (const char* list : {"locale_whitelist", "device_whitelist"}) {
+    Dictionary first = entry_;
+    first.set(list, Array{"elsewhere"});
+    backend_.reset();
+    make({first, entry_});
+    EXPECT_EQ(decide(), kBackendStateDisabled) << list;
+  }
+}
+
 TEST_F(HTTPSPostBackendState, AnUnknownModelIsInEveryBlacklist) {
   entry_.set("device_blacklist", Array{"phone8"});
   backend().setHardwareType(std::nullopt);
