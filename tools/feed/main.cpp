@@ -79,7 +79,7 @@ struct Machine {
   RapidJSONWriter json;
   ZlibDeflate deflate;
   TomlUserDefaults userDefaults{{"/nonexistent"}, log, counters, clock};
-  LinuxDeviceProperties deviceProperties{DeviceSources{}, cryptography, log};
+  LinuxDeviceProperties deviceProperties{DeviceSources{}, cryptography, log, clock};
   DefaultsDiagnosticsConsent consent{userDefaults};
   CurlURLSessionFactory urlSessions{CurlURLSessionOptions{}, log, counters};
   LinuxUDPSocketFactory udpSockets;

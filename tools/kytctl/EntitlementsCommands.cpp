@@ -17,6 +17,7 @@
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/TextEscape.h"
+#include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/system/EntitlementMatch.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/TomlEntitlements.h"
@@ -263,7 +264,8 @@ bool isGranted(const TomlEntitlementsOptions& options, const PeerCredentials& pe
   NoSink sink;
   Log log(sink);
   Counters counters;
-  TomlEntitlements entitlements(options, inspector, log, counters);
+  const LinuxClock clock;
+  TomlEntitlements entitlements(options, inspector, log, counters, clock);
   return entitlements.valueFor(peer, kEntitlement).boolValue();
 }
 

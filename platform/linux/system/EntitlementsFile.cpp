@@ -88,29 +88,34 @@ std::variant<EntitlementGrants, TomlError> parseEntitlements(std::string_view te
 
 namespace {
 
-// In a folder that others can write they could otherwise link a grant of root's that is not meant to count.
-bool isLinkOfOthers(const std::string& path, std::optional<uint32_t> trustedUser) {
-  struct stat status = {};
-  return ::lstat(path.c_str(), &status) == 0 && S_ISLNK(status.st_mode) && status.st_uid != 0 &&
-         status.st_uid != trustedUser;
+bool isLinkOfOthers(const struct stat& status, std::optional<uint32_t> trustedUser) {
+  return S_ISLNK(status.st_mode) && status.st_uid != 0 && status.st_uid != trustedUser;
+}
+
+EntitlementsFile unreadable(const std::string& path, const ReadProblem& problem) {
+  EntitlementsFile result;
+  result.path = path;
+  result.identity = identityOf(path);
+  result.unreadable = result.ignored = true;
+  result.error = problem.error;
+  result.problems.push_back(tomlError(path, 0, problem.text + ". The file is ignored"));
+  return result;
 }
 
 }  // namespace
 
 EntitlementsFile readEntitlementsFile(const std::string& path, std::optional<uint32_t> trustedUser) {
+  // In a folder that others can write they could otherwise link a grant of root's that is not meant to count.
+  struct stat link = {};
+  if (::lstat(path.c_str(), &link) != 0) return unreadable(path, {errorText(errno), errno});
+  auto contents = readRegularFile(path, kMaxTomlBytes);
+  if (const auto* wrong = std::get_if<ReadProblem>(&contents)) return unreadable(path, *wrong);
   EntitlementsFile result;
   result.path = path;
-  auto contents = readRegularFile(path, kMaxTomlBytes);
-  if (const auto* wrong = std::get_if<std::string>(&contents)) {
-    result.identity = identityOf(path);
-    result.unreadable = result.ignored = true;
-    result.problems.push_back(tomlError(path, 0, *wrong + ". The file is ignored"));
-    return result;
-  }
   const auto& file = std::get<FileContents>(contents);
   result.identity = file.identity;
   const bool trustedOwner = file.identity.owner == 0 || file.identity.owner == trustedUser;
-  if (!trustedOwner || isLinkOfOthers(path, trustedUser) || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0) {
+  if (!trustedOwner || isLinkOfOthers(link, trustedUser) || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0) {
     result.ignored = true;
     result.problems.push_back(tomlError(path, 0, "others than root can write the file. It is ignored"));
     return result;
@@ -134,12 +139,15 @@ EntitlementsListing entitlementsFiles(const std::string& path) {
     listing.error = errno;
     return listing;
   }
-  while (const dirent* entry = ::readdir(folder)) {
+  const dirent* entry = nullptr;
+  while (errno = 0, (entry = ::readdir(folder)) != nullptr) {
     const std::string_view name = entry->d_name;
     if (name == "." || name == "..") continue;
     (name.ends_with(".toml") && !name.starts_with('.') ? listing.names : listing.others).emplace_back(name);
   }
+  listing.error = errno;
   ::closedir(folder);
+  if (listing.error != 0) listing.names.clear();
   std::sort(listing.names.begin(), listing.names.end());
   std::sort(listing.others.begin(), listing.others.end());
   return listing;

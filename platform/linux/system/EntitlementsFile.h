@@ -46,6 +46,7 @@ struct EntitlementsFile {
   std::string path;
   FileIdentity identity;
   bool unreadable = false;  // to this process; its contents are unknown
+  int error = 0;            // errno, where the system refused to read it
   bool ignored = false;     // as a whole; `problems` says why
   std::vector<EntitlementGrant> grants;
   std::vector<TomlError> problems;
@@ -58,7 +59,7 @@ struct EntitlementsFile {
 struct EntitlementsListing {
   std::vector<std::string> names;   // of the files that count, in their order
   std::vector<std::string> others;  // that do not, for their names
-  int error = 0;                    // errno when the folder cannot be read
+  int error = 0;                    // errno when the folder cannot be read; then no names
 };
 [[nodiscard]] EntitlementsListing entitlementsFiles(const std::string& folder);
 

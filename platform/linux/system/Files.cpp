@@ -46,23 +46,49 @@ bool changedJustNow(const FileIdentity& identity) {
   return age < kLongestTick;
 }
 
-std::variant<FileContents, std::string> readRegularFile(const std::string& path, size_t maxBytes) {
+namespace {
+
+ReadProblem systemProblem(int error) {
+  return ReadProblem{errorText(error), error};
+}
+
+}  // namespace
+
+bool isMomentary(int error) {
+  switch (error) {
+    case EAGAIN:
+    case EBUSY:
+    case EINTR:
+    case EIO:
+    case EMFILE:
+    case ENFILE:
+    case ENOBUFS:
+    case ENOMEM:
+    case ESTALE:
+    case ETIMEDOUT:
+      return true;
+    default:
+      return false;
+  }
+}
+
+std::variant<FileContents, ReadProblem> readRegularFile(const std::string& path, size_t maxBytes) {
   // Without O_NONBLOCK a named pipe in the file's place would hold the caller for ever.
   const FileHandle file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
-  if (!file) return errorText(errno);
+  if (!file) return systemProblem(errno);
   struct stat status = {};
-  if (::fstat(file.get(), &status) != 0) return errorText(errno);
-  if (!S_ISREG(status.st_mode)) return std::string("is no regular file");
+  if (::fstat(file.get(), &status) != 0) return systemProblem(errno);
+  if (!S_ISREG(status.st_mode)) return ReadProblem{"is no regular file"};
   FileContents contents;
   contents.identity = identityOf(status);
   char buffer[16384];
   while (true) {
     const ssize_t count = ::read(file.get(), buffer, sizeof buffer);
     if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return errorText(errno);
+    if (count < 0) return systemProblem(errno);
     if (count == 0) return contents;
     contents.bytes.append(buffer, static_cast<size_t>(count));
-    if (contents.bytes.size() > maxBytes) return std::string("is too large");
+    if (contents.bytes.size() > maxBytes) return ReadProblem{"is too large"};
   }
 }
 

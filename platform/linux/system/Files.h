@@ -52,9 +52,15 @@ struct FileContents {
   std::string bytes;
   FileIdentity identity;
 };
-// The whole file, or what is wrong as text (the system's word, "is no regular file", "is too large").
-[[nodiscard]] std::variant<FileContents, std::string> readRegularFile(const std::string& path,
+struct ReadProblem {
+  std::string text;  // the system's word, "is no regular file", "is too large"
+  int error = 0;     // errno; 0: the file was seen, and is not what is wanted
+};
+[[nodiscard]] std::variant<FileContents, ReadProblem> readRegularFile(const std::string& path,
                                                                       size_t maxBytes);
+// Whether such a failure says nothing about the file: the machine lacked something (descriptors, memory, an answer of
+// its disk), and the next attempt may succeed.
+[[nodiscard]] bool isMomentary(int error);
 
 // Makes a folder and its missing parents (mode 0755 for parents). No value: it is there now.
 [[nodiscard]] std::optional<std::string> makeFolders(const std::string& path, uint32_t mode);

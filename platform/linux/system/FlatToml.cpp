@@ -119,27 +119,46 @@ std::variant<FlatToml, TomlError> parseFlatToml(std::string_view text, std::stri
   return flat;
 }
 
+void FlatTomlFile::couldNotRead(int error, const std::string& text, std::optional<TomlError>& problem) {
+  certain_ = false;
+  if (!isMomentary(error)) {
+    content_ = {};
+    identity_ = {};
+  }
+  const MonotonicTime now = clock_.monotonic();
+  if (readError_ == error && now < toldReadError_ + kToldAgainAfter) return;
+  readError_ = error;
+  toldReadError_ = now;
+  problem = tomlError(path_, 0,
+                      text + (isMomentary(error) ? ". What was read before counts until it can be read"
+                                                 : ". The file is ignored until it can be read"));
+}
+
 const FlatToml& FlatTomlFile::current(std::optional<TomlError>& problem) {
   struct stat status = {};
   if (::stat(path_.c_str(), &status) != 0) {
     const int error = errno;
+    if (error != ENOENT && error != ENOTDIR) {
+      couldNotRead(error, errorText(error), problem);
+      return content_;
+    }
     content_ = {};
     identity_ = {};
     certain_ = false;
-    if (error != ENOENT && error != ENOTDIR && openError_ != error) {
-      problem = tomlError(path_, 0, errorText(error));
-      openError_ = error;
-    }
     return content_;
   }
-  openError_ = 0;
   if (certain_ && identityOf(status) == identity_) return content_;
   auto contents = readRegularFile(path_, kMaxTomlBytes);
+  const auto* wrong = std::get_if<ReadProblem>(&contents);
+  if (wrong != nullptr && wrong->error != 0) {
+    couldNotRead(wrong->error, wrong->text, problem);
+    return content_;
+  }
   std::optional<TomlError> error;
-  identity_ = identityOf(status);
   content_ = {};
-  if (const auto* wrong = std::get_if<std::string>(&contents)) {
-    error = tomlError(path_, 0, *wrong);
+  if (wrong != nullptr) {
+    identity_ = identityOf(status);
+    error = tomlError(path_, 0, wrong->text);
   } else {
     identity_ = std::get<FileContents>(contents).identity;
     auto parsed = parseFlatToml(std::get<FileContents>(contents).bytes, path_);
@@ -151,7 +170,7 @@ const FlatToml& FlatTomlFile::current(std::optional<TomlError>& problem) {
   }
   certain_ = !changedJustNow(identity_);
   if (error && reported_ != identity_) {
-    problem = std::move(error);
+    problem = TomlError{error->text + ". The file is ignored"};
     reported_ = identity_;
   }
   return content_;

@@ -2,12 +2,14 @@
 // files. Changes are made in the text, so that an administrator's remarks and order survive them.
 #pragma once
 
+#include <chrono>
 #include <map>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <variant>
 
+#include "platform/Clock.h"
 #include "platform/Value.h"
 #include "platform/linux/system/Files.h"
 #include "platform/linux/system/Toml.h"
@@ -35,19 +37,27 @@ struct FlatToml {
 [[nodiscard]] std::variant<FlatToml, TomlError> parseFlatToml(std::string_view text, std::string_view name);
 
 // Such a file, read again when it has changed. Not safe for concurrent calls: its owner locks.
+//
+// A file that the machine cannot read at the moment (no descriptor, no memory) keeps what was read before, since the
+// failure says nothing about the file; it is tried again at every access.
 class FlatTomlFile {
  public:
-  explicit FlatTomlFile(std::string path) : path_(std::move(path)) {}
-  // What the file holds now: nothing when it is missing or bad. `problem` is set once for each state of a bad
-  // file.
+  FlatTomlFile(std::string path, const Clock& clock) : path_(std::move(path)), clock_(clock) {}
+  // What the file holds now: nothing when it is missing, bad or may not be read. `problem` is set once for each state of
+  // a bad file, and once a minute while a file cannot be read.
   [[nodiscard]] const FlatToml& current(std::optional<TomlError>& problem);
 
  private:
+  static constexpr Duration kToldAgainAfter = std::chrono::minutes(1);
+  void couldNotRead(int error, const std::string& text, std::optional<TomlError>& problem);
+
   const std::string path_;
+  const Clock& clock_;
   FileIdentity identity_;  // of what was read last
   FileIdentity reported_;  // of the state whose problem was told
   bool certain_ = false;   // nothing can have changed without changing the identity
-  int openError_ = 0;      // told already
+  int readError_ = 0;      // told last, at …
+  MonotonicTime toldReadError_;
   FlatToml content_;
 };
 

@@ -147,15 +147,19 @@ constexpr int64_t kOffsetBias = 1 << 22;  // makes every offset, at most days, p
 
 }  // namespace
 
-LinuxDeviceProperties::LinuxDeviceProperties(DeviceSources sources, Cryptography& cryptography, Log& log)
-    : sources_(std::move(sources)), cryptography_(cryptography), log_(log), overrides_(sources_.overrides) {}
+LinuxDeviceProperties::LinuxDeviceProperties(DeviceSources sources, Cryptography& cryptography, Log& log,
+                                             const Clock& clock)
+    : sources_(std::move(sources)),
+      cryptography_(cryptography),
+      log_(log),
+      overrides_(sources_.overrides, clock) {}
 
 std::optional<std::string> LinuxDeviceProperties::overridden(std::string_view key) {
   if (sources_.overrides.empty()) return std::nullopt;
   MutexLock lock(mutex_);
   std::optional<TomlError> problem;
   const FlatToml& content = overrides_.current(problem);
-  if (problem) log_.error("deviceProperties: %s. The file is ignored", problem->text.c_str());
+  if (problem) log_.error("deviceProperties: %s", problem->text.c_str());
   const Value value = content.value(key);
   if (value.isNull()) return std::nullopt;
   return description(value);

@@ -20,6 +20,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Clock.h"
 #include "platform/Cryptography.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
@@ -41,7 +42,7 @@ struct DeviceSources {
 
 class LinuxDeviceProperties final : public DeviceProperties {
  public:
-  LinuxDeviceProperties(DeviceSources sources, Cryptography& cryptography, Log& log);
+  LinuxDeviceProperties(DeviceSources sources, Cryptography& cryptography, Log& log, const Clock& clock);
 
   [[nodiscard]] std::optional<String> property(std::string_view key) override EXCLUDES(mutex_);
   [[nodiscard]] std::optional<String> countryCode() override EXCLUDES(mutex_);

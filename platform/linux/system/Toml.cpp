@@ -117,7 +117,7 @@ std::variant<TomlTable, TomlError> parseToml(std::string_view text, std::string_
 
 std::variant<std::string, TomlError> readTomlText(const std::string& path) {
   auto text = readRegularFile(path, kMaxTomlBytes);
-  if (const auto* error = std::get_if<std::string>(&text)) return tomlError(path, 0, *error);
+  if (const auto* wrong = std::get_if<ReadProblem>(&text)) return tomlError(path, 0, wrong->text);
   return std::move(std::get<FileContents>(text).bytes);
 }
 

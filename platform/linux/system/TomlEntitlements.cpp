@@ -1,16 +1,17 @@
 #include "platform/linux/system/TomlEntitlements.h"
 
 #include <algorithm>
-#include <iterator>
+#include <cerrno>
 #include <utility>
 
+#include "platform/TextEscape.h"
 #include "platform/linux/system/EntitlementMatch.h"
 
 namespace kyt {
 
 TomlEntitlements::TomlEntitlements(TomlEntitlementsOptions options, ProgramInspector& inspector, Log& log,
-                                   Counters& counters)
-    : options_(std::move(options)), inspector_(inspector), log_(log), counters_(counters) {}
+                                   Counters& counters, const Clock& clock)
+    : options_(std::move(options)), inspector_(inspector), log_(log), counters_(counters), clock_(clock) {}
 
 void TomlEntitlements::report(const std::string& path, const FileIdentity& identity,
                               const TomlError& problem) {
@@ -20,13 +21,25 @@ void TomlEntitlements::report(const std::string& path, const FileIdentity& ident
   log_.error("entitlements: %s", problem.text.c_str());
 }
 
-void TomlEntitlements::readFile(const std::string& name) {
-  EntitlementsFile file = readEntitlementsFile(options_.folder + "/" + name, options_.trustedUser);
-  if (changedJustNow(file.identity)) certain_ = false;
+void TomlEntitlements::reportMomentary(const std::string& path, int error) {
+  if (!counters_.addAndMayLog(Reason::badEntitlementsFile, clock_.monotonic())) return;
+  log_.error("entitlements: %s: %s. What it granted before counts until it can be read",
+             escapedText(path).c_str(), errorText(error).c_str());
+}
+
+void TomlEntitlements::readFile(const std::string& path, std::vector<File>& former) {
+  EntitlementsFile file = readEntitlementsFile(path, options_.trustedUser);
+  if (file.error != 0 || changedJustNow(file.identity)) certain_ = false;
+  if (isMomentary(file.error)) {
+    reportMomentary(path, file.error);
+    const auto known =
+        std::find_if(former.begin(), former.end(), [&](const File& one) { return one.path == path; });
+    if (known != former.end()) files_.push_back(std::move(*known));
+    return;
+  }
   for (const TomlError& problem : file.problems) report(file.path, file.identity, problem);
-  std::move(file.grants.begin(), file.grants.end(), std::back_inserter(grants_));
   reported_[file.path] = file.identity;
-  files_.push_back({std::move(file.path), file.identity});
+  files_.push_back({std::move(file.path), file.identity, std::move(file.grants)});
 }
 
 bool TomlEntitlements::isCurrent() const {
@@ -35,16 +48,34 @@ bool TomlEntitlements::isCurrent() const {
                      [](const File& file) { return identityOf(file.path) == file.identity; });
 }
 
+// Of the files there are; of those known when that cannot be told now.
+std::vector<std::string> TomlEntitlements::paths(const std::vector<File>& former) {
+  std::vector<std::string> paths;
+  const EntitlementsListing listing = entitlementsFiles(options_.folder);
+  for (const std::string& name : listing.names) paths.push_back(options_.folder + "/" + name);
+  if (listing.error == 0) return paths;
+  certain_ = false;
+  if (isMomentary(listing.error)) {
+    reportMomentary(options_.folder, listing.error);
+    for (const File& file : former) paths.push_back(file.path);
+  } else if (listing.error != ENOENT) {
+    report(options_.folder, folder_,
+           tomlError(options_.folder, 0, errorText(listing.error) + ". Nobody is granted anything"));
+    reported_[options_.folder] = folder_;
+  }
+  return paths;
+}
+
 void TomlEntitlements::refresh() {
   if (isCurrent()) return;
+  std::vector<File> former = std::exchange(files_, {});
   certain_ = true;
-  files_.clear();
-  grants_.clear();
   folder_ = identityOf(options_.folder);
   if (changedJustNow(folder_)) certain_ = false;
-  for (const std::string& name : entitlementsFiles(options_.folder).names) readFile(name);
+  for (const std::string& path : paths(former)) readFile(path, former);
   std::erase_if(reported_, [this](const auto& entry) REQUIRES(mutex_) {
-    return std::none_of(files_.begin(), files_.end(),
+    return entry.first != options_.folder &&
+           std::none_of(files_.begin(), files_.end(),
                         [&](const File& file) { return file.path == entry.first; });
   });
 }
@@ -64,10 +95,13 @@ Value TomlEntitlements::valueFor(const PeerCredentials& peer, std::string_view k
   refresh();
   Value result;
   EntitlementMatch match(peer, inspector_);
-  for (const EntitlementGrant& grant : grants_) {
-    const auto value = grant.values.find(key);
-    if (value == grant.values.end() || !match.matches(grant)) continue;
-    if (result.isNull() || value->second.boolValue()) result = value->second;
+  for (const File& file : files_) {
+    for (const EntitlementGrant& grant : file.grants) {
+      const auto value = grant.values.find(key);
+      if (value == grant.values.end() || !match.matches(grant)) continue;
+      if (result.isNull() || value->second.boolValue()) result = value->second;
+      if (result.boolValue()) break;
+    }
     if (result.boolValue()) break;
   }
   if (match.lack()) sayOnce(*match.lack());

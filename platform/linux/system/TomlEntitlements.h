@@ -1,7 +1,9 @@
 // Who may connect, as entitlements.d/*.toml grants it (EntitlementsFile.h). Any matching grant suffices. Each problem of a
 // file is logged once for each state of the file.
 //
-// The files are looked at (a stat each) for every connection and read again when they changed.
+// The files are looked at (a stat each) for every connection and read again when they changed. What the machine cannot
+// read at the moment (no descriptor, no memory) keeps its former grants, is tried again for the next connection, and is
+// logged at most once a minute.
 #pragma once
 
 #include <map>
@@ -12,6 +14,7 @@
 #include <variant>
 #include <vector>
 
+#include "platform/Clock.h"
 #include "platform/Counters.h"
 #include "platform/Entitlements.h"
 #include "platform/Log.h"
@@ -30,8 +33,8 @@ struct TomlEntitlementsOptions {
 
 class TomlEntitlements final : public Entitlements {
  public:
-  TomlEntitlements(TomlEntitlementsOptions options, ProgramInspector& inspector, Log& log,
-                   Counters& counters);
+  TomlEntitlements(TomlEntitlementsOptions options, ProgramInspector& inspector, Log& log, Counters& counters,
+                   const Clock& clock);
   [[nodiscard]] Value valueFor(const PeerCredentials& peer, std::string_view key) override EXCLUDES(mutex_);
   [[nodiscard]] std::string executableOf(const PeerCredentials& peer) override;
 
@@ -39,24 +42,27 @@ class TomlEntitlements final : public Entitlements {
   struct File {
     std::string path;
     FileIdentity identity;
+    std::vector<EntitlementGrant> grants;
   };
   void refresh() REQUIRES(mutex_);
   [[nodiscard]] bool isCurrent() const REQUIRES(mutex_);
-  void readFile(const std::string& name) REQUIRES(mutex_);
+  [[nodiscard]] std::vector<std::string> paths(const std::vector<File>& former) REQUIRES(mutex_);
+  void readFile(const std::string& path, std::vector<File>& former) REQUIRES(mutex_);
   void report(const std::string& path, const FileIdentity& identity, const TomlError& problem)
       REQUIRES(mutex_);
+  void reportMomentary(const std::string& path, int error) REQUIRES(mutex_);
   void sayOnce(const std::string& why) REQUIRES(mutex_);
 
   const TomlEntitlementsOptions options_;
   ProgramInspector& inspector_;
   Log& log_;
   Counters& counters_;
+  const Clock& clock_;
   Mutex mutex_;
   bool certain_ GUARDED_BY(mutex_) = false;  // what was read holds as long as the identities do
   bool saidNoInspection_ GUARDED_BY(mutex_) = false;
   FileIdentity folder_ GUARDED_BY(mutex_);
   std::vector<File> files_ GUARDED_BY(mutex_);
-  std::vector<EntitlementGrant> grants_ GUARDED_BY(mutex_);
   std::map<std::string, FileIdentity> reported_ GUARDED_BY(mutex_);
 };
 

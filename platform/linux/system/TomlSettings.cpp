@@ -159,7 +159,7 @@ std::vector<std::string> settingNames() {
 
 std::variant<Settings, TomlError> readSettings(const std::string& path) {
   auto contents = readRegularFile(path, kMaxTomlBytes);
-  if (const auto* error = std::get_if<std::string>(&contents)) return tomlError(path, 0, *error);
+  if (const auto* wrong = std::get_if<ReadProblem>(&contents)) return tomlError(path, 0, wrong->text);
   const auto& file = std::get<FileContents>(contents);
   const bool trustedOwner = file.identity.owner == 0 || file.identity.owner == ::geteuid();
   if (!trustedOwner || (file.identity.mode & (S_IWGRP | S_IWOTH)) != 0)

@@ -55,13 +55,14 @@ const FlatToml& TomlUserDefaults::current(std::string_view domain) {
   auto found = domains_.find(domain);
   if (found == domains_.end()) {
     found =
-        domains_.emplace(std::string(domain), std::make_unique<FlatTomlFile>(path(domain, ".toml"))).first;
+        domains_.emplace(std::string(domain), std::make_unique<FlatTomlFile>(path(domain, ".toml"), clock_))
+            .first;
   }
   std::optional<TomlError> problem;
   const FlatToml& content = found->second->current(problem);
   if (problem) {
     counters_.add(Reason::badUserDefaultsFile);
-    log_.error("userDefaults: %s. The file is ignored", problem->text.c_str());
+    log_.error("userDefaults: %s", problem->text.c_str());
   }
   return content;
 }
@@ -139,7 +140,8 @@ std::variant<Value, Error> TomlUserDefaults::store(std::string_view domainName, 
   if (::lstat(file.c_str(), &status) == 0) {
     if (!S_ISREG(status.st_mode)) return failure(EINVAL, file + ": is no regular file");
     auto contents = readRegularFile(file, kMaxTomlBytes);
-    if (const auto* wrong = std::get_if<std::string>(&contents)) return failure(EIO, file + ": " + *wrong);
+    if (const auto* wrong = std::get_if<ReadProblem>(&contents))
+      return failure(EIO, file + ": " + wrong->text);
     auto parsed = parseFlatToml(std::get<FileContents>(contents).bytes, file);
     if (auto* wrong = std::get_if<TomlError>(&parsed)) return failure(EINVAL, wrong->text);
     content = std::move(std::get<FlatToml>(parsed));

@@ -12,8 +12,10 @@
 #include <vector>
 
 #include "platform/fake/FakeUserDefaults.h"
+#include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/NoDescriptors.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -42,7 +44,7 @@ class LinuxDevicePropertiesTest : public testing::Test {
   LinuxDeviceProperties make() {
     return LinuxDeviceProperties({folder_ / "device.toml", folder_ / "os-release", folder_ / "machine-info",
                                   folder_ / "machine-id", folder_ / "dmi", folder_ / "tree"},
-                                 digests_, log_);
+                                 digests_, log_, clock_);
   }
   std::string property(const char* key) {
     auto properties = make();
@@ -53,6 +55,7 @@ class LinuxDevicePropertiesTest : public testing::Test {
   MemoryLogSink sink_;
   Log log_{sink_};
   Digests digests_;
+  ManualClock clock_;
 };
 
 TEST_F(LinuxDevicePropertiesTest, ReadsOsRelease) {
@@ -131,7 +134,7 @@ TEST_F(LinuxDevicePropertiesTest, TheApplicationSpecificMachineIDIsTheSystemLibr
     std::snprintf(hex, sizeof hex, "%02x", static_cast<unsigned>(byte));
     expected += hex;
   }
-  LinuxDeviceProperties properties(DeviceSources{}, digests_, log_);
+  LinuxDeviceProperties properties(DeviceSources{}, digests_, log_, clock_);
   const auto id = properties.property("UniqueDeviceID");
   ASSERT_TRUE(id);
   EXPECT_EQ(*id, expected);
@@ -277,6 +280,19 @@ TEST(DefaultsDiagnosticsConsent, IsTheUserDefaultAndNoValueIsNo) {
   EXPECT_FALSE(consent.isSubmissionAllowed());
   defaults.put("com.vantu.diagnostics", "consent", Value("yes"));
   EXPECT_TRUE(consent.isSubmissionAllowed());
+}
+
+TEST_F(LinuxDevicePropertiesTest, OverridesThatCannotBeOpenedForAMomentStay) {
+  folder_.write("device.toml", "SerialNumber = \"S1\"\n");
+  auto properties = make();
+  ASSERT_EQ(properties.property("SerialNumber"), String("S1"));
+  folder_.write("device.toml", "SerialNumber = \"S2\"\n");
+  {
+    const NoDescriptors none;
+    EXPECT_EQ(properties.property("SerialNumber"), String("S1"));
+  }
+  EXPECT_EQ(sink_.count(LogLevel::error, "device.toml: Too many open files"), 1u);
+  EXPECT_EQ(properties.property("SerialNumber"), String("S2"));
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "platform/fake/MemoryLogSink.h"
+#include "tests/support/NoDescriptors.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -47,6 +48,24 @@ TEST(TomlBundle, TheShippedOnesAreOfThisVersion) {
   EXPECT_EQ(TomlBundle(KYT_PACKAGING_SHARE "/KYTReporting.bundle", log).version(), String("8.0"));
   EXPECT_EQ(TomlBundle(KYT_PACKAGING_SHARE "/kytreportingd.bundle", log).version(), String("8.0"));
   EXPECT_TRUE(sink.lines().empty());
+}
+
+TEST(TomlBundle, ReadsWhatCouldNotBeOpenedAtTheStartWhenItIsAskedFor) {
+  const TemporaryFolder folder;
+  MemoryLogSink sink;
+  Log log(sink);
+  folder.write("info.toml", "version = \"8.0\"\n");
+  folder.write("publicKey.der", "key");
+  std::optional<TomlBundle> bundle;
+  {
+    const NoDescriptors none;
+    bundle.emplace(folder.path(), log);
+    EXPECT_EQ(bundle->resource("publicKey", "der"), std::nullopt);
+  }
+  EXPECT_TRUE(sink.contains(LogLevel::error, "bundle: " + folder.path() + ": Too many open files"));
+  EXPECT_EQ(bundle->version(), String("8.0"));
+  ASSERT_TRUE(bundle->resource("publicKey", "der"));
+  EXPECT_EQ(bundle->resource("publicKey", "der")->view(), "key");
 }
 
 }  // namespace

@@ -17,9 +17,11 @@
 #include <vector>
 
 #include "platform/Keys.h"
+#include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/NoDescriptors.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -53,14 +55,15 @@ class TomlEntitlementsTest : public testing::Test {
   MemoryLogSink sink_;
   Log log_{sink_};
   Counters counters_;
+  ManualClock clock_;
   DirectProgramInspector inspector_;
-  TomlEntitlements entitlements_{{folder_.path(), ::geteuid()}, inspector_, log_, counters_};
+  TomlEntitlements entitlements_{{folder_.path(), ::geteuid()}, inspector_, log_, counters_, clock_};
 };
 
 TEST_F(TomlEntitlementsTest, NobodyIsGrantedAnythingWithoutFiles) {
   EXPECT_TRUE(value(peer(0)).isNull());
   EXPECT_TRUE(sink_.lines().empty());
-  TomlEntitlements elsewhere({folder_ / "none", ::geteuid()}, inspector_, log_, counters_);
+  TomlEntitlements elsewhere({folder_ / "none", ::geteuid()}, inspector_, log_, counters_, clock_);
   EXPECT_TRUE(elsewhere.valueFor(peer(0), kEntitlement).isNull());
 }
 
@@ -148,7 +151,7 @@ TEST_F(TomlEntitlementsTest, AFileOfAnotherOwnerIsIgnored) {
   ASSERT_EQ(::chown((folder_ / "a.toml").c_str(), 1234, 0), 0);
   EXPECT_FALSE(isGranted(peer(5)));
   EXPECT_EQ(sink_.count("others than root can write the file"), 1u);
-  TomlEntitlements trusting({folder_.path(), 1234}, inspector_, log_, counters_);
+  TomlEntitlements trusting({folder_.path(), 1234}, inspector_, log_, counters_, clock_);
   EXPECT_TRUE(trusting.valueFor(peer(5), kEntitlement).boolValue())
       << "the user of a private root may own its files";
 }
@@ -255,7 +258,7 @@ class RefusingInspector final : public ProgramInspector {
 
 TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatIsToldOnce) {
   RefusingInspector refusing(EACCES);
-  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_, clock_);
   grant("executable = \"/proc/self/exe\"\n");
   PeerCredentials self = peer(1);
   self.pidfd = pidfdOf(::getpid());
@@ -267,7 +270,7 @@ TEST_F(TomlEntitlementsTest, WithoutThePrivilegeAnExecutableNeverMatchesAndThatI
 // A mount of /proc that hides other users' processes.
 TEST_F(TomlEntitlementsTest, AProcessThatIsHiddenIsALackOfPrivilegeToo) {
   RefusingInspector hidden(ESRCH);
-  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, hidden, log_, counters_);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, hidden, log_, counters_, clock_);
   grant("executable = \"/proc/self/exe\"\n");
   PeerCredentials self = peer(1);
   self.pidfd = pidfdOf(::getpid());
@@ -278,7 +281,7 @@ TEST_F(TomlEntitlementsTest, AProcessThatIsHiddenIsALackOfPrivilegeToo) {
 
 TEST_F(TomlEntitlementsTest, AProcessThatIsEndingIsNoLackOfPrivilege) {
   RefusingInspector ending(ENOENT);
-  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, ending, log_, counters_);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, ending, log_, counters_, clock_);
   grant("executable = \"/proc/self/exe\"\n");
   PeerCredentials self = peer(1);
   self.pidfd = pidfdOf(::getpid());
@@ -288,7 +291,7 @@ TEST_F(TomlEntitlementsTest, AProcessThatIsEndingIsNoLackOfPrivilege) {
 
 TEST_F(TomlEntitlementsTest, AsksOnceForAConnectionWhatItRuns) {
   RefusingInspector refusing(EACCES);
-  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_);
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, refusing, log_, counters_, clock_);
   for (const char* name : {"a.toml", "b.toml", "c.toml"}) grant("executable = \"/proc/self/exe\"\n", name);
   PeerCredentials self = peer(1);
   self.pidfd = pidfdOf(::getpid());
@@ -407,6 +410,62 @@ TEST(ProgramInspectorProcess, ThatStandsStillIsWaitedForOnceAndAnswersWhenItGoes
     EXPECT_TRUE(eventually([&] { return inspector.runningProgram(::getpid()).index() == 0; }));
     EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ESRCH) << "the answer of another question";
   }
+}
+
+TEST_F(TomlEntitlementsTest, WhatCannotBeOpenedForAMomentKeepsItsGrants) {
+  grant("user = 1234\n");
+  grant("user = 5678\n", "b.toml");
+  ASSERT_TRUE(isGranted(peer(1234)));
+  ::chmod((folder_ / "a.toml").c_str(), 0640);  // a change, so that the file is looked at again
+  for (int i = 0; i < 3; ++i) {
+    const NoDescriptors none;
+    EXPECT_TRUE(isGranted(peer(1234)));
+    EXPECT_TRUE(isGranted(peer(5678)));
+    EXPECT_FALSE(isGranted(peer(1)));
+  }
+  EXPECT_EQ(
+      sink_.count(LogLevel::error, "Too many open files. What it granted before counts until it can be read"),
+      1u)
+      << "a line a minute";
+  clock_.advance(std::chrono::seconds(61));
+  {
+    const NoDescriptors none;
+    EXPECT_TRUE(isGranted(peer(1234)));
+  }
+  EXPECT_EQ(sink_.count("Too many open files"), 2u);
+  grant("user = 4321\n");
+  EXPECT_TRUE(isGranted(peer(4321))) << "a change counts as soon as the file can be read";
+  EXPECT_FALSE(isGranted(peer(1234)));
+  ::unlink((folder_ / "b.toml").c_str());
+  {
+    const NoDescriptors none;
+    EXPECT_FALSE(isGranted(peer(5678)))
+        << "a file that is gone grants nothing, whether or not the folder can be listed";
+  }
+}
+
+TEST_F(TomlEntitlementsTest, WhatCouldNotBeOpenedAtFirstIsReadWithoutAChange) {
+  grant("user = 1234\n");
+  // Old enough for its times to tell every change.
+  const auto ago = [&](const std::string& path) { return changedJustNow(identityOf(path)); };
+  ASSERT_TRUE(eventually([&] { return !ago(folder_ / "a.toml") && !ago(folder_.path()); }));
+  {
+    const NoDescriptors none;
+    EXPECT_FALSE(isGranted(peer(1234)));
+  }
+  EXPECT_TRUE(isGranted(peer(1234)));
+}
+
+TEST_F(TomlEntitlementsTest, AFolderThatMayNotBeListedIsSaidOnce) {
+  if (::geteuid() == 0) GTEST_SKIP() << "root may list everything";
+  grant("user = 1234\n");
+  ::chmod(folder_.path().c_str(), 0311);
+  EXPECT_FALSE(isGranted(peer(1234)));
+  EXPECT_FALSE(isGranted(peer(1234)));
+  EXPECT_EQ(sink_.count(LogLevel::error, folder_.path() + ": Permission denied. Nobody is granted anything"),
+            1u);
+  ::chmod(folder_.path().c_str(), 0755);
+  EXPECT_TRUE(isGranted(peer(1234)));
 }
 
 }  // namespace

@@ -15,6 +15,8 @@
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/Eventually.h"
+#include "tests/support/NoDescriptors.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -345,6 +347,43 @@ TEST_F(TomlUserDefaultsTest, ProcessesThatRaceForAnIdentifierAgree) {
   EXPECT_EQ(answers.size(), 1u) << "every process was answered the same identifiers";
   ::close(ends[0]);
   ::close(ends[1]);
+}
+
+TEST_F(TomlUserDefaultsTest, WhatCannotBeOpenedForAMomentKeepsItsValues) {
+  folder_.write("com.vantu.diagnostics.toml", "consent = true\n");
+  auto defaults = make();
+  const auto consent = [&] { return defaults.value("com.vantu.diagnostics", "consent"); };
+  ASSERT_EQ(consent(), Value(true));
+  folder_.write("com.vantu.diagnostics.toml", "consent = true #\n");
+  for (int i = 0; i < 3; ++i) {
+    const NoDescriptors none;
+    EXPECT_EQ(consent(), Value(true));
+  }
+  EXPECT_EQ(
+      sink_.count(LogLevel::error,
+                  "com.vantu.diagnostics.toml: Too many open files. What was read before counts until it can "
+                  "be read"),
+      1u)
+      << "a line a minute";
+  clock_.advance(std::chrono::seconds(61));
+  {
+    const NoDescriptors none;
+    EXPECT_EQ(consent(), Value(true));
+  }
+  EXPECT_EQ(sink_.count("Too many open files"), 2u);
+  folder_.write("com.vantu.diagnostics.toml", "consent = false\n");
+  EXPECT_EQ(consent(), Value(false)) << "a change counts as soon as the file can be read";
+}
+
+TEST_F(TomlUserDefaultsTest, WhatCouldNotBeOpenedAtFirstIsReadWithoutAChange) {
+  const std::string file = folder_.write(kFile, "n = 1\n");
+  ASSERT_TRUE(eventually([&] { return !changedJustNow(identityOf(file)); }));
+  auto defaults = make();
+  {
+    const NoDescriptors none;
+    EXPECT_TRUE(defaults.value(kDomain, "n").isNull());
+  }
+  EXPECT_EQ(defaults.value(kDomain, "n"), Value(1));
 }
 
 }  // namespace
