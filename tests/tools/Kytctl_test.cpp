@@ -22,6 +22,9 @@ class KytctlOnAStage : public StageTest {
     putBag("dulvek", {entry("person")});
     startDaemon();
   }
+  [[nodiscard]] static std::string opening(const std::string& sessionInfo) {
+    return R"({"do":"open","sessionInfo":)" + sessionInfo + "}\n";
+  }
 };
 
 TEST_F(KytctlOnAStage, SendsOneEvent) {
@@ -87,6 +90,56 @@ TEST_F(KytctlOnAStage, RunsAScriptedSessionFromAFileOrFromStandardInput) {
   EXPECT_TRUE(arrive("client=person&method=3", 12000));
 }
 
+TEST_F(KytctlOnAStage, CountsAMessageThatWasSentWithAReplyAsSent) {
+  const ProgramRun run =
+      kytctl({"session", "-"}, opening("{\"SessionID\":6,\"ClientType\":8}") +
+                                   R"({"do":"configure"})"
+                                   "\n"
+                                   R"({"do":"send","category":3,"type":1})"
+                                   "\n"
+                                   R"({"do":"send","category":3,"type":1,"reply":true,"repeat":2})"
+                                   "\n"
+                                   R"({"do":"finish"})"
+                                   "\n");
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_TRUE(has(run.text, "sent 3, lost 0, dropped 0\n")) << run.text;
+}
+
+TEST_F(KytctlOnAStage, RefusesToSendBeforeTheSessionIsConfigured) {
+  const ProgramRun run = kytctl(
+      {"session", "-"}, opening("{\"ClientType\":8}") + "{\"do\":\"send\",\"category\":3,\"type\":1}\n");
+  EXPECT_EQ(run.status, 1);
+  EXPECT_TRUE(has(run.text, "kytctl: send: the daemon drops what comes before the session is configured"))
+      << run.text;
+}
+
+// Each would be read as 0, as no, or as nothing.
+TEST_F(KytctlOnAStage, RefusesKeysThatAStepDoesNotHave) {
+  const std::pair<const char*, const char*> steps[] = {
+      {R"("send","category":3,"typ":1)", R"(send: unknown key "typ"; there are category, type, payload)"},
+      {R"("send","category":3)", R"(send: "type" is missing)"},
+      {R"("send","category":"three","type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
+      {R"("send","category":70000,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
+      {R"("send","category":-1,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
+      {R"("send","category":1.5,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
+      {R"("send","category":1,"type":1,"payload":[1])", R"(send: "payload" must be an object)"},
+      {R"("send","category":1,"type":1,"reply":"yes")", R"(send: "reply" must be true or false)"},
+      {R"("send","category":1,"type":1,"repeat":18446744073709551615)", R"(send: "repeat" must be a whole)"},
+      {R"("configure","userInfo":{})", R"(configure: unknown key "userInfo"; there are none)"},
+      {R"("states","userinfo":{})", R"(states: unknown key "userinfo"; there are userInfo)"},
+      {R"("sharedData")", R"(sharedData: "entries" is missing)"},
+      {R"("digestKey","hex":"00f")", R"(digestKey: "hex" is no hex)"},
+      {R"("digestKey","hex":7)", R"(digestKey: "hex" must be text)"},
+      {R"("wait","message":1)", R"(wait: unknown key "message"; there are messages)"}};
+  for (const auto& [step, complaint] : steps) {
+    const ProgramRun run =
+        kytctl({"session", "-"},
+               opening("{\"ClientType\":8}") + "{\"do\":\"configure\"}\n" + "{\"do\":" + step + "}\n");
+    EXPECT_EQ(run.status, 1) << step;
+    EXPECT_TRUE(has(run.text, std::string("kytctl: ") + complaint)) << run.text;
+  }
+}
+
 TEST_F(KytctlOnAStage, AWrongScriptEndsAtItsLine) {
   const std::pair<const char*, const char*> scripts[] = {
       {"{\"do\":\"configure\"}\n", "the first step is {\"do\":\"open\"}"},
@@ -145,6 +198,68 @@ TEST_F(Kytctl, GivesUpWithoutADaemon) {
       run({"send", "--timeout", "0.2", "--client-type", "8", "--category", "1", "--type", "1"});
   EXPECT_EQ(sent.status, 1);
   EXPECT_TRUE(has(sent.text, "kytctl: send: ")) << sent.text;
+}
+
+// A misspelt promise of user information would take the session out of the consent's reach.
+TEST_F(Kytctl, RefusesSessionInformationThatTheDaemonWouldNotUnderstand) {
+  const std::pair<const char*, const char*> wrong[] = {
+      {R"({"ClientType":8,"RequireUserinfo":true})",
+       R"(sessionInfo: unknown key "RequireUserinfo"; there are SessionID, ClientType)"},
+      {R"({"ClientType":8,"RequireUserInfo":"on"})",
+       R"(sessionInfo: "RequireUserInfo" must be true or false)"},
+      {R"({"ClientType":8,"BatchEvent":1})", R"(sessionInfo: "BatchEvent" must be true or false)"},
+      {R"({"SessionID":1})", R"(sessionInfo: "ClientType" is missing)"},
+      {R"({"ClientType":24})", R"(sessionInfo: "ClientType" must be a whole number from 0 to 23)"},
+      {R"({"ClientType":"8"})", R"(sessionInfo: "ClientType" must be a whole number from 0 to 23)"},
+      {R"({"ClientType":8,"SessionID":4294967296})",
+       R"(sessionInfo: "SessionID" must be a whole number from 0 to 4294967295)"},
+      {R"({"ClientType":8,"ClientVersion":65536})", R"(sessionInfo: "ClientVersion" must be a whole number)"},
+      {R"({"ClientType":8,"HierarchyToken":"t"})", R"(sessionInfo: "HierarchyToken" must be an object)"},
+      {R"({"ClientType":8,"HierarchyToken":{"Token":"t"}})",
+       R"(sessionInfo: HierarchyToken: unknown key "Token"; there are TokenID, Level)"},
+      {R"({"ClientType":8,"HierarchyToken":{"Level":1}})",
+       R"(sessionInfo: HierarchyToken: "TokenID" is missing)"}};
+  for (const auto& [sessionInfo, complaint] : wrong) {
+    const ProgramRun opened =
+        run({"session", "-"}, std::string(R"({"do":"open","sessionInfo":)") + sessionInfo + "}\n");
+    EXPECT_EQ(opened.status, 1) << sessionInfo;
+    EXPECT_TRUE(has(opened.text, std::string("kytctl: open: ") + complaint)) << opened.text;
+  }
+  EXPECT_TRUE(has(run({"session", "-"}, "{\"do\":\"open\"}\n").text, "open: \"sessionInfo\" is missing"));
+  const ProgramRun sent = run({"send", "--client-type", "24", "--category", "1", "--type", "1"});
+  EXPECT_EQ(sent.status, 2);
+  EXPECT_TRUE(has(sent.text, "--client-type: Value 24 not in range 0 to 23")) << sent.text;
+}
+
+TEST_F(Kytctl, NamesTheSocketWhereNoDaemonListensAndWhy) {
+  const std::vector<std::string> event = {"send", "--timeout", "20", "--client-type", "8", "--category",
+                                          "1",    "--type",    "1"};
+  const std::string socket = folder_ / "run/kytreportingd/com.vantu.kytreportingd";
+  const ProgramRun sent = run(event);
+  EXPECT_EQ(sent.status, 1);
+  EXPECT_EQ(sent.text, "kytctl: send: no daemon listens at " + socket + ": No such file or directory\n");
+  const ProgramRun configured =
+      run({"session", "--timeout", "0.2", "-"},
+          "{\"do\":\"open\",\"sessionInfo\":{\"ClientType\":8}}\n{\"do\":\"configure\"}\n");
+  EXPECT_EQ(configured.status, 1);
+  EXPECT_EQ(configured.text,
+            "kytctl: configure: no daemon listens at " + socket + ": No such file or directory\n");
+  // One that ended without removing its socket.
+  const std::string stale = folder_ / "stale";
+  ASSERT_EQ(runProgram("python3",
+                       {"-c", "import socket,sys; socket.socket(socket.AF_UNIX).bind(sys.argv[1])", stale})
+                .status,
+            0);
+  std::vector<std::string> elsewhere = event;
+  elsewhere.insert(elsewhere.end(), {"--socket", stale});
+  EXPECT_EQ(run(elsewhere).text, "kytctl: send: no daemon listens at " + stale + ": Connection refused\n");
+  elsewhere.back() = "/" + std::string(200, 'x');
+  EXPECT_TRUE(has(run(elsewhere).text, "xxx: File name too long\n"));
+}
+
+TEST_F(Kytctl, HelpOfSendSaysWhatFinishedMeans) {
+  const std::string help = run({"send", "--help"}).text;
+  EXPECT_TRUE(has(help, "\"finished\" means that the daemon had a storebag")) << help;
 }
 
 TEST_F(Kytctl, WritesReadsAndDeletesUserDefaults) {

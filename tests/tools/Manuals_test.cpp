@@ -116,8 +116,8 @@ TEST(ManualOfKytctl, ShowsEachCommandInItsSynopsis) {
 }
 
 TEST(ManualOfKytctl, NamesEachStepOfAScriptedSession) {
-  const std::string source = textOf("tools/kytctl/SessionCommands.cpp");
-  const Names steps = matchesIn(source, "\\{\"([A-Za-z]+)\", &Script::");
+  const std::string source = textOf("tools/kytctl/SessionScript.cpp");
+  const Names steps = matchesIn(source, "&Script::([A-Za-z]+)");
   EXPECT_GE(steps.size(), 10U);
   EXPECT_EQ(matchesIn(itemsOf(sectionOf("kytctl.1", "kytctl session")), "\\.It Ic ([A-Za-z]+)"), steps);
   const std::string help = runProgram(KYT_PROGRAMS "/kytctl", {"session", "--help"}).text;

@@ -17,8 +17,13 @@ struct Arguments {
   int status = 0;
 };
 
+constexpr char kFinished[] =
+    R"("finished" means that the daemon had a storebag for the client type and has offered the event to its back ends.
+It does not mean that the event was sent: no consent, another country, a list, sampling or a server may have stopped
+it. The daemon's log and the server tell.)";
+
 constexpr char kSessionSteps[] =
-    R"(Steps, by "do"; from standard input each runs as soon as its line is there:
+    R"(Steps, by "do"; from standard input each runs as soon as its line is there. A key that a step does not have is an error:
   {"do":"open","sessionInfo":{…},"userInfo":{…}}   first; the keys are SessionID, ClientType, …;
                                                    "aggregate":true prints each message of the hierarchy
   {"do":"configure"}                               prints the live back ends
@@ -43,7 +48,9 @@ void addConnectionOptions(CLI::App& command, Arguments& arguments) {
 void addSend(CLI::App& app, Arguments& a) {
   CLI::App* send = app.add_subcommand("send", "Send one event without a session of its own");
   addConnectionOptions(*send, a);
-  send->add_option("--client-type", a.send.clientType, "The client type, 0 to 23")->required();
+  send->add_option("--client-type", a.send.clientType, "The client type, 0 to 23")
+      ->required()
+      ->check(CLI::Range(0, 23));
   send->add_option("--session-id", a.send.sessionID, "The session ID, 32 bits");
   send->add_option("--client-version", a.send.clientVersion, "The client version, 16 bits");
   send->add_option("--category", a.send.category, "The event's category (method)")->required();
@@ -52,6 +59,7 @@ void addSend(CLI::App& app, Arguments& a) {
   send->add_option("--user-info", a.send.userInfoJSON,
                    "A JSON object; ClientName and ServiceName choose the client entry");
   send->add_flag("--require-user-info", a.send.requireUserInfo, "The session promises user information");
+  send->footer(kFinished);
   send->callback([&a] { a.status = sendCommand(a.connection, a.send); });
 
   CLI::App* session =

@@ -1,0 +1,50 @@
+// What kytctl's commands that talk to the daemon have in common: where it listens, the wait for its answer, and why
+// there is none.
+#pragma once
+
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Error.h"
+#include "tools/kytctl/Commands.h"
+
+namespace kyt::tools {
+
+// What a completion said, waited for by the command's own thread. Shared: the completion may come after the
+// time-out.
+class Answer {
+ public:
+  void set(std::string text, std::optional<Error> error);
+  // None after `seconds` without an answer.
+  [[nodiscard]] std::optional<std::pair<std::string, std::optional<Error>>> wait(double seconds);
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::string text_;
+  std::optional<Error> error_;
+  bool set_ = false;
+};
+
+// The socket that is meant: --socket, below --root, the environment's KYTREPORTING_SOCKET, or the fixed one.
+[[nodiscard]] std::string socketPath(const ConnectionOptions& connection);
+
+// "no daemon listens at PATH: REASON" when nobody takes a connection there now, or none.
+[[nodiscard]] std::optional<std::string> noDaemon(const ConnectionOptions& connection);
+
+// Says that `what` failed, and why; answers 1. The text stands unless nobody listens.
+int failedCall(const ConnectionOptions& connection, const std::string& what, const std::string& text);
+
+// Waits, and prints the answer; 0 when there was one. Texts that are empty are not printed.
+int report(const std::shared_ptr<Answer>& answer, const ConnectionOptions& connection,
+           const std::string& what);
+
+// "no storebag", or "live:" and the names.
+[[nodiscard]] std::string statesText(const std::optional<std::vector<std::string>>& states);
+
+}  // namespace kyt::tools

@@ -1,0 +1,54 @@
+// A session by hand, step by step: each step is a JSON object whose "do" names it.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "kytreporting/KYTReporting.h"
+#include "platform/Value.h"
+#include "tools/kytctl/Answers.h"
+#include "tools/kytctl/KeyRules.h"
+
+namespace kyt::tools {
+
+class SessionScript {
+ public:
+  // `connection` stays with the caller, who keeps it as long.
+  explicit SessionScript(const ConnectionOptions& connection);
+
+  // Runs one step and waits for its answer: 0, or 1 with a line on standard error.
+  [[nodiscard]] int run(const Dictionary& step);
+
+ private:
+  class Aggregated;
+  struct Step {
+    int (SessionScript::*run)(const Dictionary&);
+    std::vector<KeyRule> keys;  // besides "do"
+  };
+
+  [[nodiscard]] static std::map<std::string, Step> allSteps();
+
+  int open(const Dictionary& step);
+  int configure(const Dictionary& step);
+  int states(const Dictionary& step);
+  int send(const Dictionary& step);
+  int sendWithReply(uint16_t category, uint16_t type, const Dictionary& payload, uint32_t flag);
+  int flush(const Dictionary& step);
+  int displayURL(const Dictionary& step);
+  int sharedData(const Dictionary& step);
+  int digestKey(const Dictionary& step);
+  int wait(const Dictionary& step);
+  int finish(const Dictionary& step);
+  [[nodiscard]] bool waitForRoom();
+
+  const ConnectionOptions& connection_;
+  const std::map<std::string, Step> steps_;
+  const std::shared_ptr<Aggregated> aggregated_;  // also the library's thread's
+  uint64_t answered_ = 0;                         // messages that were sent with a reply, and got one
+  bool configured_ = false;                       // what is sent before is dropped by the daemon
+  std::unique_ptr<KYTReporting> session_;
+};
+
+}  // namespace kyt::tools
