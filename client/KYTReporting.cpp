@@ -142,7 +142,7 @@ void KYTReporting::uploadFile(const std::string& path, SuccessCompletion complet
   const std::string absolute = linux_client::absolutePath(path);
   const linux_client::OpenedFile opened = linux_client::openFileAndFolder(absolute);
   if (opened.file < 0) {
-    command->fail(ClientError::refused, opened.error);
+    command->fail(ClientError::invalid, opened.error);
     return;
   }
   command->text = fileURL(absolute);

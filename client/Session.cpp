@@ -42,10 +42,16 @@ size_t messageBytes(const Dictionary& payload) {
   return bytes;
 }
 
+std::string problemOf(const Dictionary& sessionInfo) {
+  const std::optional<Error> error = KYTReporting::checkSessionInfo(sessionInfo);
+  return error ? error->localizedDescription : "";
+}
+
 }  // namespace
 
 Session::Session(KYTReporting::Options options, Loop* loop, bool single)
-    : path_(std::move(options.socketPath)),
+    : problem_(problemOf(options.sessionInfo)),
+      path_(std::move(options.socketPath)),
       single_(single),
       maxQueuedBytes_(std::max<size_t>(options.maxQueuedBytes, 4096)),
       loop_(loop),
@@ -53,7 +59,9 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
       sessionInfo_(std::move(options.sessionInfo)),
       userInfo_(std::move(options.userInfo)),
       frameworks_(std::move(options.frameworksToCheck)),
-      aggregationBlock_(std::move(options.aggregationBlock)) {}
+      aggregationBlock_(std::move(options.aggregationBlock)) {
+  closed_ = !problem_.empty();
+}
 
 Session::~Session() {
   // Commands that were queued while the session ended.
@@ -66,7 +74,7 @@ Session::~Session() {
 
 bool Session::enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payload, uint32_t flag) {
   if (refuses()) {
-    droppedClosed_.fetch_add(1, std::memory_order_relaxed);
+    (problem_.empty() ? droppedClosed_ : droppedInvalid_).fetch_add(1, std::memory_order_relaxed);
     return false;
   }
   Item item;
@@ -90,7 +98,8 @@ bool Session::enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payl
 
 void Session::enqueueCommand(std::unique_ptr<Command> command) {
   if (refuses()) {
-    command->fail(ClientError::closed, "the session is closed");
+    const Error error = refusal();
+    command->fail(static_cast<ClientError>(error.code), error.localizedDescription);
     return;
   }
   Item item;
@@ -106,6 +115,11 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
   if (item.command) item.command->fail(ClientError::queueFull, "the queue is full");
   // NOLINTEND(bugprone-use-after-move)
   noticeWork();
+}
+
+Error Session::refusal() const {
+  return problem_.empty() ? clientError(ClientError::closed, "the session is closed")
+                          : clientError(ClientError::invalid, problem_);
 }
 
 void Session::noticeWork() {
@@ -296,7 +310,7 @@ bool Session::drain() {
     const uint32_t serial = ++serial_;
     if (!encodeCommand(*item.command, serial)) {
       droppedInvalid_.fetch_add(1);
-      item.command->fail(ClientError::refused,
+      item.command->fail(ClientError::invalid,
                          "the arguments cannot be sent: too large, or nested too deeply");
       continue;
     }

@@ -84,6 +84,7 @@ class Session {
     return inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed) ||
            saidGoodbye_.load(std::memory_order_relaxed);
   }
+  [[nodiscard]] Error refusal() const;
   void noticeWork();
   void connect(SteadyTime now);
   void disconnected(SteadyTime now, const char* reason);
@@ -104,6 +105,7 @@ class Session {
   static void complete(Command& command, const Message& message);
 
   // Constant.
+  const std::string problem_;  // of the session's information: nothing is sent
   const std::string path_;
   const bool single_;
   const size_t maxQueuedBytes_;

@@ -1,7 +1,9 @@
 // The C interface: thin over the C++ one. Nothing thrown leaves it.
 #include "kytreporting/kytreporting.h"
 
+#include <algorithm>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -88,6 +90,16 @@ KYTReporting::ObjectCompletion objectCompletion(kyt_text_callback callback, void
   };
 }
 
+// What fits, never half a character.
+void copyText(std::string_view text, char* out, size_t size) {
+  if (out == nullptr || size == 0) return;
+  size_t length = std::min(text.size(), size - 1);
+  while (length < text.size() && length > 0 && (static_cast<unsigned char>(text[length]) & 0xC0) == 0x80)
+    --length;
+  text.copy(out, length);
+  out[length] = '\0';
+}
+
 void append(kyt_array* array, Value value) {
   if (array != nullptr) array->value.append(std::move(value));
 }
@@ -172,6 +184,12 @@ double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* k
   return value != nullptr ? value->doubleValue() : otherwise;
 }
 
+int kyt_session_info_check(const kyt_dictionary* session_info, char* error, size_t size) {
+  const auto problem =
+      KYTReporting::checkSessionInfo(session_info != nullptr ? session_info->value : Dictionary());
+  copyText(problem ? problem->localizedDescription : "", error, size);
+  return problem ? 0 : 1;
+}
 kyt_session* kyt_session_open(const kyt_options* options) {
   if (options == nullptr || options->size == 0) return nullptr;
   return new kyt_session{KYTReporting::open(optionsOf(*options))};

@@ -9,11 +9,8 @@
 int main(int argc, char** argv) {
   kyt::KYTReporting::Options options;
   if (argc > 1) options.socketPath = argv[1];
-  options.sessionInfo = {{kyt::kKYTReportingSessionInfoSessionID, 42},
-                         {kyt::kKYTReportingSessionInfoClientType, 20},
-                         {kyt::kKYTReportingSessionInfoClientVersion, 1},
-                         {kyt::kKYTReportingSessionInfoBatchEvent, true},
-                         {kyt::kKYTReportingSessionInfoRequireUserInfo, true}};
+  options.sessionInfo =
+      kyt::SessionInfo{.sessionID = 42, .clientType = 20, .clientVersion = 1, .batchEvent = true};
   options.userInfo = kyt::Dictionary{{kyt::kKYTReportingUserInfoClientName, "example"},
                                      {kyt::kKYTReportingUserInfoServiceName, "demo"}};
   const auto session = kyt::KYTReporting::open(std::move(options));

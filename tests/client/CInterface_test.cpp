@@ -160,6 +160,37 @@ TEST(CInterface, TakesMissingArgumentsWithoutHarm) {
   kyt_dictionary_free(dictionary);
 }
 
+TEST(CInterface, NamesTheKeyThatIsWrongInASessionsInformation) {
+  kyt_dictionary* info = kyt_dictionary_new();
+  kyt_dictionary_set_int(info, "ClientType", 20);
+  char text[256] = "?";
+  EXPECT_EQ(kyt_session_info_check(info, text, sizeof text), 1);
+  EXPECT_STREQ(text, "");
+  kyt_dictionary_set_bool(info, "RequireUserinfo", 1);
+  EXPECT_EQ(kyt_session_info_check(info, text, sizeof text), 0);
+  EXPECT_NE(std::string(text).find("there is no key \"RequireUserinfo\""), std::string::npos);
+  EXPECT_EQ(kyt_session_info_check(info, text, 8), 0);
+  EXPECT_STREQ(text, "session");
+  EXPECT_EQ(kyt_session_info_check(info, nullptr, 0), 0);
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = "/nonexistent";
+  options.session_info = info;
+  kyt_session* session = kyt_session_open(&options);
+  kyt_dictionary_free(info);
+  ASSERT_NE(session, nullptr);
+  EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 0);
+  std::promise<std::string> configured;
+  kyt_session_configure(
+      session,
+      [](const char* const*, size_t, int, const char* error, void* context) {
+        static_cast<std::promise<std::string>*>(context)->set_value(error != nullptr ? error : "");
+      },
+      &configured);
+  EXPECT_NE(answerOf(configured).find("RequireUserinfo"), std::string::npos);
+  kyt_session_close(session);
+}
+
 TEST(CInterface, TakesOptionsOfAnOlderLibraryThatWereSmaller) {
   kyt_options options{};
   options.size = offsetof(kyt_options, user_info);

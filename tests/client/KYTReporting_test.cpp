@@ -307,6 +307,86 @@ TEST_F(KYTReportingTest, ASingleMessageWithoutADaemonFails) {
   EXPECT_TRUE(answerOf(done));
 }
 
+TEST_F(KYTReportingTest, TakesItsInformationTypedAndSendsItWithTheKeysThatTheDaemonReads) {
+  const Dictionary info = SessionInfo{.sessionID = 42,
+                                      .clientType = 7,
+                                      .clientVersion = 3,
+                                      .batchEvent = true,
+                                      .hierarchyToken = SessionInfo::HierarchyToken{"token", 1}};
+  EXPECT_EQ(info, (Dictionary{{"SessionID", 42U},
+                              {"ClientType", 7U},
+                              {"ClientVersion", 3U},
+                              {"BatchEvent", true},
+                              {"RequireUserInfo", true},
+                              {"HierarchyToken", Dictionary{{"TokenID", "token"}, {"Level", 1U}}}}));
+  EXPECT_FALSE(KYTReporting::checkSessionInfo(info));
+  ASSERT_TRUE(daemon_.start());
+  KYTReporting::Options typed = options();
+  typed.sessionInfo = SessionInfo{.sessionID = 43, .clientType = 7};
+  const auto session = KYTReporting::open(std::move(typed));
+  EXPECT_TRUE(session->finish());
+  EXPECT_EQ(daemon_.calls(), (std::vector<std::string>{"SetSessionInfo 43", "Finish"}));
+}
+
+TEST_F(KYTReportingTest, NamesTheKeyThatIsWrongInASessionsInformation) {
+  const auto problemOf = [](const Dictionary& info) {
+    const std::optional<Error> error = KYTReporting::checkSessionInfo(info);
+    return error ? error->localizedDescription : "none";
+  };
+  const std::string keys =
+      "; there are SessionID, ClientType, ClientVersion, BatchEvent, RequireUserInfo, "
+      "HierarchyToken";
+  const std::string begin = "session information: ";
+  EXPECT_EQ(problemOf({{"RequireUserinfo", true}}), begin + "there is no key \"RequireUserinfo\"" + keys);
+  EXPECT_EQ(problemOf({{"ClientTyp\n", 7}}), begin + "there is no key \"ClientTyp\\n\"" + keys);
+  EXPECT_EQ(problemOf({{"RequireUserInfo", "on"}}), begin + "\"RequireUserInfo\" is no boolean: on");
+  EXPECT_EQ(problemOf({{"RequireUserInfo", Value()}}), begin + "\"RequireUserInfo\" is no boolean: (null)");
+  EXPECT_EQ(problemOf({{"BatchEvent", 2}}), begin + "\"BatchEvent\" is no boolean: 2");
+  EXPECT_EQ(problemOf({{"ClientType", 24}}), begin + "\"ClientType\" is no whole number from 0 to 23: 24");
+  EXPECT_EQ(problemOf({{"ClientType", "7"}}), begin + "\"ClientType\" is no whole number from 0 to 23: 7");
+  EXPECT_EQ(problemOf({{"ClientVersion", 65536}}),
+            begin + "\"ClientVersion\" is no whole number from 0 to 65535: 65536");
+  EXPECT_EQ(problemOf({{"SessionID", -1}}),
+            begin + "\"SessionID\" is no whole number from 0 to 4294967295: -1");
+  EXPECT_EQ(problemOf({{"HierarchyToken", "t"}}), begin + "\"HierarchyToken\" is no dictionary: t");
+  EXPECT_EQ(problemOf({{"HierarchyToken", Dictionary{{"TokenId", "t"}}}}),
+            "HierarchyToken: there is no key \"TokenId\"; there are TokenID, Level");
+  EXPECT_EQ(problemOf({{"HierarchyToken", Dictionary{{"TokenID", 5}}}}),
+            "HierarchyToken: \"TokenID\" is no text: 5");
+  EXPECT_EQ(problemOf({}), "none");
+  EXPECT_EQ(problemOf({{"SessionID", ~0U}, {"ClientType", 23}, {"BatchEvent", 1}, {"RequireUserInfo", 0U}}),
+            "none");
+}
+
+TEST_F(KYTReportingTest, SendsNothingForASessionWhoseInformationIsWrong) {
+  ASSERT_TRUE(daemon_.start());
+  KYTReporting::Options wrong = options();
+  wrong.sessionInfo.set("RequireUserinfo", true);
+  {
+    const auto session = KYTReporting::open(std::move(wrong));
+    EXPECT_FALSE(session->sendMessage(1, 1, {}));
+    EXPECT_EQ(session->statistics().droppedInvalid, 1U);
+    std::promise<std::optional<Error>> configured;
+    session->startConfiguration(
+        [&](auto, std::optional<Error> error) { configured.set_value(std::move(error)); });
+    const auto error = answerOf(configured);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code, static_cast<int32_t>(ClientError::invalid));
+    EXPECT_NE(error->localizedDescription.find("\"RequireUserinfo\""), std::string::npos);
+    EXPECT_FALSE(session->finish());
+  }
+  KYTReporting::Options single = options();
+  single.sessionInfo.set("BatchEvent", "on");
+  std::promise<std::optional<Error>> sent;
+  KYTReporting::sendSingleMessage(
+      std::move(single), 5, 6, std::nullopt,
+      [&](auto, std::optional<Error> error) { sent.set_value(std::move(error)); });
+  const auto error = answerOf(sent);
+  ASSERT_TRUE(error);
+  EXPECT_NE(error->localizedDescription.find("\"BatchEvent\""), std::string::npos);
+  EXPECT_EQ(daemon_.connections(), 0U);
+}
+
 // Each of these ends the library's thread, which may be over before the call that started it.
 TEST_F(KYTReportingTest, EveryThreadOfTheLibraryHasItsNameFromTheBeginning) {
   for (int i = 0; i < 300; ++i) {

@@ -51,6 +51,27 @@ enum class ClientError : int32_t {
   closed = 2,        // the session was closed, or belongs to the parent of this process
   queueFull = 3,     // the bounded queue had no room
   refused = 4,       // the daemon answered with an error (the description has its text)
+  invalid = 5,       // the arguments cannot be meant or sent so (the description names what)
+};
+
+// A session's information, typed: what a misspelt key or a value of another type cannot happen to.
+struct SessionInfo {
+  uint32_t sessionID = 0;      // the program's own number for the session; log lines show it
+  uint8_t clientType = 0;      // 0 to 23: which kind of client; 5 to 23 have a storebag
+  uint16_t clientVersion = 0;  // goes with every record
+  bool batchEvent = false;     // collect events until a flush, a threshold or the session's end
+  // The program gives user information. Then the owner's consent, and locale, device, filter and sampling
+  // rules apply. False is for what says nothing about anyone.
+  bool requireUserInfo = true;
+  struct HierarchyToken {
+    std::string tokenID;  // the same for all sessions of the hierarchy: 128 random bits as text
+    uint32_t level = 0;   // 0 is the top
+  };
+  std::optional<HierarchyToken> hierarchyToken = std::nullopt;
+
+  [[nodiscard]] Dictionary dictionary() const;
+  // What Options::sessionInfo takes.
+  operator Dictionary() const { return dictionary(); }  // NOLINT(google-explicit-constructor)
 };
 
 // A message that this session receives for itself and its descendants, when it aggregates. The last one, when
@@ -69,8 +90,9 @@ class KYT_EXPORT KYTReporting {
     // The daemon's socket. Empty: the environment's KYTREPORTING_SOCKET, or
     // /run/kytreportingd/com.vantu.kytreportingd.
     std::string socketPath;
-    // Keys: kKYTReportingSessionInfo… (SessionID 32 bits, ClientType 0 to 23, ClientVersion 16 bits,
-    // BatchEvent, RequireUserInfo, HierarchyToken).
+    // A SessionInfo, or a dictionary with the keys kKYTReportingSessionInfo…: SessionID (32 bits), ClientType
+    // (0 to 23), ClientVersion (16 bits), BatchEvent, RequireUserInfo (booleans, or 0 and 1), HierarchyToken
+    // (a dictionary: TokenID, text; Level, 32 bits). Each may be absent. See checkSessionInfo().
     Dictionary sessionInfo;
     std::optional<Dictionary> userInfo;  // kKYTReportingUserInfo… and whatever else every event shall carry
     Value frameworksToCheck;
@@ -87,10 +109,15 @@ class KYT_EXPORT KYTReporting {
     uint64_t lostOnConnectionEnd =
         0;                        // written or queued, but their connection ended before the daemon took them
     uint64_t droppedClosed = 0;   // sent after close, or in a child process
-    uint64_t droppedInvalid = 0;  // could not be encoded (too large, no UTF-8, nested too deep)
+    uint64_t droppedInvalid = 0;  // could not be encoded, or their session's information is wrong
     uint64_t connections = 0;     // connections made, the first included
     uint64_t queued = 0;          // in the queue now
   };
+
+  // What is wrong with a session's information: a key that there is not, or a value of another type or out of
+  // range. The description names the key; none when all is right. The daemon would take such an entry as
+  // absent, so a session with one sends nothing: sendMessage() returns false, and completions get this error.
+  [[nodiscard]] static std::optional<Error> checkSessionInfo(const Dictionary& sessionInfo);
 
   // Never blocks and never fails: a daemon that does not run yet is waited for.
   [[nodiscard]] static std::unique_ptr<KYTReporting> open(Options options);

@@ -84,6 +84,12 @@ typedef struct kyt_options {
   size_t max_queued_bytes;    /* 0: the default, 4 MiB */
 } kyt_options;
 
+/* Whether a session's information can be meant so: 0 when it has a key that there is not, or a value of another
+ * type or out of range. Then `error`, of `size` bytes (none: null and 0), gets a text that names the key, cut to fit
+ * and NUL-terminated; otherwise "". A session opened with such information sends nothing, and its callbacks get
+ * this error. */
+KYT_API int kyt_session_info_check(const kyt_dictionary* session_info, char* error, size_t size);
+
 /* Null only for missing options. */
 KYT_API kyt_session* kyt_session_open(const kyt_options* options);
 /* What was queued and not sent is lost; finish first to keep it. No callback runs after it has returned. */
