@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "backend/Text.h"
+#include "platform/Counters.h"
 #include "platform/Cryptography.h"
 #include "platform/Platform.h"
 #include "platform/SerialQueue.h"
@@ -85,10 +86,12 @@ void KYTReportingBackend::updateState() {
 
 Value KYTReportingBackend::sendMessage(Dictionary, const TimeValue&, uint16_t, uint16_t, EventID,
                                        MessageFlag) {
+  platform_.counters.add(Reason::notForThisBackEnd);
   return {};
 }
 
 Value KYTReportingBackend::sendMessage(const Dictionary&, const TimeValue&, uint16_t, uint16_t, EventID) {
+  platform_.counters.add(Reason::notForThisBackEnd);
   return {};
 }
 

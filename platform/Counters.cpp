@@ -28,6 +28,32 @@ const char* reasonName(Reason reason) {
       return "client-not-reading";
     case Reason::aggregatorMessageDropped:
       return "aggregator-message-dropped";
+    case Reason::sessionInfoKeyUnknown:
+      return "session-info-key-unknown";
+    case Reason::sessionInfoValueMistyped:
+      return "session-info-value-mistyped";
+    case Reason::notConfigured:
+      return "not-configured";
+    case Reason::noStorebag:
+      return "no-storebag";
+    case Reason::noBackEnds:
+      return "no-back-ends";
+    case Reason::identifiersMissing:
+      return "identifiers-missing";
+    case Reason::categoryOrTypeMissing:
+      return "category-or-type-missing";
+    case Reason::eventFiltered:
+      return "event-filtered";
+    case Reason::notForThisBackEnd:
+      return "not-for-this-back-end";
+    case Reason::adaptorUnavailable:
+      return "adaptor-unavailable";
+    case Reason::datagramDisplaced:
+      return "datagram-displaced";
+    case Reason::datagramUnacknowledged:
+      return "datagram-unacknowledged";
+    case Reason::datagramGivenUp:
+      return "datagram-given-up";
     case Reason::batchFull:
       return "batch-full";
     case Reason::eventDroppedByState:
@@ -40,10 +66,20 @@ const char* reasonName(Reason reason) {
       return "post-without-url";
     case Reason::postWithoutPoster:
       return "post-without-poster";
+    case Reason::postWithoutClientID:
+      return "post-without-client-id";
     case Reason::postFailed:
       return "post-failed";
     case Reason::postRefused:
       return "post-refused";
+    case Reason::postRedirected:
+      return "post-redirected";
+    case Reason::requestFailed:
+      return "request-failed";
+    case Reason::requestRefused:
+      return "request-refused";
+    case Reason::requestRedirected:
+      return "request-redirected";
     case Reason::waitingRequestDisplaced:
       return "waiting-request-displaced";
     case Reason::outstandingBytesExceeded:

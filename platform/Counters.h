@@ -25,14 +25,33 @@ enum class Reason : uint8_t {
   queuedBytesExceeded,  // reading from a client stopped
   clientNotReading,     // … and its connection ended
   aggregatorMessageDropped,
-  batchFull,             // an event dropped because its back end's batch is full
-  eventDroppedByState,   // a disabled back end dropped an event
-  batchDiscarded,        // records discarded with a batch whose back end is not enabled
-  batchedEventFiltered,  // records rejected by the lists at a flush
+  sessionInfoKeyUnknown,     // an entry of the session's information that means nothing here
+  sessionInfoValueMistyped,  // … whose value is of another type than its key's
+  notConfigured,             // a message of a session before its configuration
+  noStorebag,                // … whose configuration found no storebag
+  noBackEnds,                // … whose storebag names no back end for it
+  identifiersMissing,        // a single message without client type or session ID
+  categoryOrTypeMissing,     // a message without one of them
+  eventFiltered,             // an event that a back end's lists refuse when it is sent
+  notForThisBackEnd,         // an event for a back end of a kind that sends none
+  adaptorUnavailable,        // an event for an adaptor that is not there or does not take it
+  datagramDisplaced,         // a datagram dropped because too many wait
+  datagramUnacknowledged,    // … after its last retransmission
+  datagramGivenUp,           // … with its back end
+  batchFull,                 // an event dropped because its back end's batch is full
+  eventDroppedByState,       // a disabled back end dropped an event
+  batchDiscarded,            // records discarded with a batch whose back end is not enabled
+  batchedEventFiltered,      // records rejected by the lists at a flush
+  // Of what stands in a post, each event, and each file or log data, counts.
   postWithoutURL,
-  postWithoutPoster,         // a request whose session was gone: nothing was sent
-  postFailed,                // a request ended with a transport error; its events are lost
-  postRefused,               // a server answered 4xx or 5xx
+  postWithoutPoster,  // the session was gone: nothing was sent
+  postWithoutClientID,
+  postFailed,      // ended with a transport error
+  postRefused,     // answered 4xx or 5xx
+  postRedirected,  // answered 3xx, which is not followed
+  requestFailed,   // the posts of events themselves
+  requestRefused,
+  requestRedirected,
   waitingRequestDisplaced,   // a request dropped while waiting for connectivity
   outstandingBytesExceeded,  // a request refused since too much of its session was not answered yet
   workersExhausted,          // work waited because all workers were in use

@@ -4,6 +4,7 @@
 #include <cassert>
 #include <utility>
 
+#include "platform/Counters.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
@@ -11,6 +12,7 @@
 #include "platform/System.h"
 #include "platform/UserDefaults.h"
 #include "session/ReportingSessionConnectivityHelper.h"
+#include "session/SessionInfoCheck.h"
 
 namespace kyt {
 
@@ -62,6 +64,10 @@ Log& ReportingdSession::log() const {
   return platform().log;
 }
 
+Counters& ReportingdSession::counters() const {
+  return platform().counters;
+}
+
 std::string ReportingdSession::description() const {
   return formatObjects("<ReportingdSession %@>", {_sessionIDString});
 }
@@ -74,6 +80,7 @@ bool ReportingdSession::requiresUserInfo() const {
 
 // Under one hold of the monitor, so that no other session finds the new level under the old registration.
 void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
+  countMistakes(sessionInfo, platform());
   const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
   const Value* token = sessionInfo.find(kKYTReportingSessionInfoHierarchyToken);
   MonitorLock lock(_sessionDelegate.monitor());
@@ -103,6 +110,7 @@ void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dic
 void ReportingdSession::startConfigWithCompletionHandler(StatesReply reply) {
   log().debug("startConfigWithCompletionHandler: Starting configuration for session %u", _sessionID);
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
+  withoutBackends_ = storebag ? Reason::noBackEnds : Reason::noStorebag;
   if (!storebag) {
     if (reply) reply(std::nullopt);
     return;

@@ -23,6 +23,7 @@
 #include "backend/BackendFactory.h"
 #include "config/DeviceIdentity.h"
 #include "platform/Clock.h"
+#include "platform/Counters.h"
 #include "platform/Value.h"
 #include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/Listener.h"
@@ -137,6 +138,7 @@ class ReportingdSession final : public ClientSessionInterface,
 
   [[nodiscard]] Platform& platform() const { return class_.platform(); }
   [[nodiscard]] Log& log() const;
+  [[nodiscard]] Counters& counters() const;
 
   // Constant after construction.
   ReportingdSessionClass& class_;
@@ -158,6 +160,7 @@ class ReportingdSession final : public ClientSessionInterface,
   Value _frameworks;             // kept for the session's life; nothing here reads it
   Dictionary _periodicServices;  // nothing here fills it
   std::optional<String> _storebagVersion;
+  Reason withoutBackends_ = Reason::notConfigured;  // why a message finds no back end, when it finds none
   bool _hasFinishedGracefully = false;
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()

@@ -3,6 +3,7 @@
 #include "backend/BackendFactory.h"
 #include "config/DeviceIdentity.h"
 #include "platform/Clock.h"
+#include "platform/Counters.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
@@ -48,6 +49,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
   if (!sessionInfo || !storebag) {
     // The leading "R" is part of the message that tools look for.
     log.error("RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters");
+    platform().counters.add(storebag ? Reason::identifiersMissing : Reason::noStorebag);
     return;
   }
   char deviceID[kDeviceIDSize] = {};
@@ -56,6 +58,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
       backendFactory_.createBackends(storebag, sessionInfo, userInfo, deviceID);
   if (!backends || backends->empty()) {
     log.error("sendMessageWithSessionInfo: No backends available to send single message");
+    platform().counters.add(Reason::noBackEnds);
     return;
   }
   if (userInfo && !boolEntry(*sessionInfo, kKYTReportingSessionInfoRequireUserInfo))
@@ -70,12 +73,14 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
       log.debug(
           "sendMessageWithSessionInfo: Dropping event with category %d as it is not whitelisted for backend %s",
           category, backend->name().c_str());
+      platform().counters.add(Reason::eventFiltered);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
       log.debug(
           "sendMessageWithSessionInfo: Dropping event with category %d as it is blacklisted for backend %s",
           category, backend->name().c_str());
+      platform().counters.add(Reason::eventFiltered);
       continue;
     }
     Dictionary message = payload.value_or(Dictionary());

@@ -2,6 +2,7 @@
 // internal messages take too, and the one for single messages of clients that configure nothing.
 #include <utility>
 
+#include "platform/Counters.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
@@ -19,16 +20,19 @@ void ReportingdSession::sendMessageWithDictionary(Dictionary message, ObjectRepl
 Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!hasBackends()) {
     log().debug("sendMessageWithDictionary: No backends available to send message");
+    counters().add(withoutBackends_);
     return nullptr;
   }
   const Value* category = message.find(kKYTReportingMessageParametersCategory);
   if (category == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
+    counters().add(Reason::categoryOrTypeMissing);
     return nullptr;
   }
   const Value* type = message.find(kKYTReportingMessageParametersType);
   if (type == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
+    counters().add(Reason::categoryOrTypeMissing);
     return nullptr;
   }
   const auto method = static_cast<uint16_t>(category->unsignedIntValue());
@@ -69,12 +73,14 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
           category, backend->name().c_str());
+      counters().add(Reason::eventFiltered);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is blacklisted for backend %s",
           category, backend->name().c_str());
+      counters().add(Reason::eventFiltered);
       continue;
     }
     Value result = backend->sendMessage(left == 0 ? std::exchange(envelope, {}) : envelope, timestamp,
@@ -107,6 +113,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   if (!sessionInfo.contains(kKYTReportingSessionInfoClientType) ||
       !sessionInfo.contains(kKYTReportingSessionInfoSessionID)) {
     log().error("sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo");
+    counters().add(Reason::identifiersMissing);
     if (reply) reply("Could not retrieve identifiers from sessionInfo");
     return;
   }
@@ -115,6 +122,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   log().debug("sendMessageWithSessionInfo: Sending message with session info for session %u", _sessionID);
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
   if (!storebag) {
+    counters().add(Reason::noStorebag);
     if (reply) reply("storebag not available");
     return;
   }

@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "platform/Counters.h"
 #include "platform/Platform.h"
 #include "platform/PowerLog.h"
 
@@ -27,7 +28,10 @@ std::shared_ptr<AmpyxBackend> AmpyxBackend::initWithName(Configuration& configur
 
 Value AmpyxBackend::sendMessage(const Dictionary& message, const TimeValue&, uint16_t method,
                                 uint16_t respCode, EventID eventID) {
-  if (method == 0 || message.empty()) return {};
+  if (method == 0 || message.empty()) {
+    platform_.counters.add(Reason::notForThisBackEnd);
+    return {};
+  }
   Dictionary entry = message;
   entry.set("method", unsigned{method});
   entry.set("respCode", unsigned{respCode});

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "config/ClientTypes.h"
+#include "platform/Counters.h"
 #include "platform/InternetAddress.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
@@ -104,7 +105,10 @@ DashboardBackend::DashboardBackend(Platform& platform, String name, const std::o
       period_(kDefaultPeriod),
       socket_(std::move(socket)) {}
 
-DashboardBackend::~DashboardBackend() = default;
+DashboardBackend::~DashboardBackend() {
+  // What was handed over runs with a reference, so nobody else is here any more.
+  platform_.counters.add(Reason::datagramGivenUp, messageQueue_.size());
+}
 
 bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
                              uint16_t serverPort) {
@@ -216,6 +220,7 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
   std::unique_ptr<DashboardDatagram> datagram(new (std::nothrow) DashboardDatagram);
   if (datagram == nullptr) {
     platform_.log.error("DashboardBackend(sendMessage): can't malloc.");
+    platform_.counters.add(Reason::datagramGivenUp);
     return {};
   }
   datagram->fill(headerFor(timestamp, method, respCode, eventID));

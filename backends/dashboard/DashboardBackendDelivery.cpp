@@ -2,6 +2,7 @@
 #include <array>
 
 #include "backends/dashboard/DashboardBackend.h"
+#include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
 
@@ -48,7 +49,9 @@ void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID e
       UDPPacketToSend::initWithBytes(datagram.bytes(), datagram.length(), static_cast<uint16_t>(eventNumber));
   if (sent) packet->setState(UDPPacketToSend::kWaiting);
   messageQueue_.push_back(std::move(packet));
-  if (messageQueue_.size() > kMaxPackets) messageQueue_.pop_front();
+  if (messageQueue_.size() <= kMaxPackets) return;
+  messageQueue_.pop_front();
+  platform_.counters.add(Reason::datagramDisplaced);
 }
 
 void DashboardBackend::processSocketRead() {
@@ -71,7 +74,10 @@ void DashboardBackend::processSocketRead() {
 
 bool DashboardBackend::checkWaiting(UDPPacketToSend& packet) {
   const int32_t retransmits = packet.numberOfRetransmits();
-  if (retransmits >= kMaxRetransmits) return true;
+  if (retransmits >= kMaxRetransmits) {
+    platform_.counters.add(Reason::datagramUnacknowledged);
+    return true;
+  }
   const int32_t checks = packet.numberOfChecks() + 1;
   if (checks < kWaitTable[static_cast<size_t>(retransmits)]) {
     packet.setNumberOfChecks(checks);
@@ -141,6 +147,8 @@ void DashboardBackend::cleanupSources() {
   timer_.cancel();
   readSource_.cancel();
   socket_.reset();
+  platform_.counters.add(Reason::datagramGivenUp, messageQueue_.size());
+  messageQueue_.clear();
 }
 
 }  // namespace kyt

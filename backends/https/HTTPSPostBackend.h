@@ -70,8 +70,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] std::optional<std::string> createMessageForPostAndLogging(Array records,
                                                                           Value* prettyJSONString);
   // The completion gets (nothing, error or nothing); it is never called without a connectivity delegate.
+  // `events` is how many are lost with the message.
   void postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
-                       std::optional<uint16_t> responseCode, FlushCompletion completion);
+                       std::optional<uint16_t> responseCode, FlushCompletion completion, size_t events = 1);
 
   [[nodiscard]] const std::optional<String>& postURL() const { return postURL_; }
   void setPostURL(std::optional<String> value) { postURL_ = std::move(value); }

@@ -147,6 +147,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   Array records = recordsToPost(std::move(batch), bytes);
   Value pretty;
   std::optional<std::string> json;
+  const size_t events = records.size();
   if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty);
   if (!json) {
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
@@ -157,7 +158,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
     answer = [pretty, completion = std::move(completion)](const Value&, std::optional<Error> error) mutable {
       completion(pretty, std::move(error));
     };
-  postJSONMessage(std::move(*json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer));
+  postJSONMessage(std::move(*json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer), events);
   if (!pretty.isNull()) immutable_ = true;
   return pretty;
 }

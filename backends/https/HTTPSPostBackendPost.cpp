@@ -45,17 +45,24 @@ struct Reply {
   Platform& platform;
   String name;
   FlushCompletion completion;
+  size_t events;
 
   void operator()(std::optional<Data>, std::optional<URLResponse> response, std::optional<Error> error) {
     if (error) {
-      platform.counters.add(Reason::postFailed);
+      count(Reason::requestFailed, Reason::postFailed);
       platform.log.error("HTTPSPostBackend(postJsonMessage): post error: %s",
                          error->localizedDescription.c_str());
     }
     const int status = response ? response->status : 0;
-    if (status >= 400 && status <= 599) platform.counters.add(Reason::postRefused);
+    if (status >= 300 && status <= 399) count(Reason::requestRedirected, Reason::postRedirected);
+    if (status >= 400 && status <= 599) count(Reason::requestRefused, Reason::postRefused);
     if (status >= 500 && status <= 599) error = disable(status);
     if (completion) completion(Value(), std::move(error));
+  }
+
+  void count(Reason request, Reason lost) {
+    platform.counters.add(request);
+    platform.counters.add(lost, events);
   }
 
   Error disable(int status) {
@@ -114,6 +121,8 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
   if (const std::optional<String> client = clientID()) {
     entries.append("clientId", *client);
     entries.append("events", Value(std::move(records)));
+  } else {
+    platform_.counters.add(Reason::postWithoutClientID, records.size());
   }
   const Value message(std::move(entries));
   std::string json;
@@ -184,10 +193,11 @@ URLRequest HTTPSPostBackend::newRequest(std::string url, std::string json, std::
 }
 
 void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
-                                       std::optional<uint16_t> responseCode, FlushCompletion completion) {
+                                       std::optional<uint16_t> responseCode, FlushCompletion completion,
+                                       size_t events) {
   const std::optional<String>& url = isRealtime(flag) ? realtimePostURL_ : postURL_;
   if (!url) {
-    platform_.counters.add(Reason::postWithoutURL);
+    platform_.counters.add(Reason::postWithoutURL, events);
     if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
     return;
   }
@@ -195,11 +205,11 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
   const auto delegate = connectivityDelegate();
   // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
   if (delegate == nullptr) {
-    platform_.counters.add(Reason::postWithoutPoster);
+    platform_.counters.add(Reason::postWithoutPoster, events);
     return;
   }
   delegate->postURLRequestWithCompletionHandler(
-      std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion)});
+      std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion), events});
 }
 
 }  // namespace kyt

@@ -3,6 +3,7 @@
 #include <string>
 #include <utility>
 
+#include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
 
@@ -64,6 +65,7 @@ Value QDXBackend::sendMessage(Dictionary message, const TimeValue&, uint16_t met
     qdxAdaptor_->invoke(kForwardingOperation, method, respCode, message);
     return {};
   }
+  platform_.counters.add(Reason::adaptorUnavailable);
   const std::string adaptor = qdxAdaptor_ != nullptr ? qdxAdaptor_->description() : "(null)";
   platform_.log.error("QDXBackend(sendMessage): QDX adaptor %s does not respond to forwarding selector %s",
                       adaptor.c_str(), kForwardingOperation);

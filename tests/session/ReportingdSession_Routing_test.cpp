@@ -302,5 +302,65 @@ TEST_F(SingleMessage, ConcurrentFirstOnesShareOneHelper) {
   EXPECT_EQ(test_.urlSessions.sessionsCreated(), before + 1);
 }
 
+class DroppedMessages : public MessageRouting {
+ protected:
+  uint64_t count(Reason reason) const { return test_.counters.value(reason); }
+  void sendSingle(const Dictionary& info) {
+    client_.session->sendMessageWithSessionInfo(info, std::nullopt, 4, 1, std::nullopt, nullptr);
+  }
+};
+
+TEST_F(DroppedMessages, CountByWhatTheirSessionLacks) {
+  send(message(1, 2));
+  send(message(1, 2));
+  EXPECT_EQ(count(Reason::notConfigured), 2U);
+  client_.session->setSessionInfo(sessionInfo(), std::nullopt, nullptr, false);
+  client_.session->startConfigWithCompletionHandler(nullptr);
+  send(message(1, 2));
+  EXPECT_EQ(count(Reason::noStorebag), 1U);
+  configure({});
+  send(message(1, 2));
+  EXPECT_EQ(count(Reason::noBackEnds), 2U) << "the start message is one";
+  configure({"httppost"});
+  send(message(1, 2));
+  EXPECT_EQ(count(Reason::notConfigured), 2U);
+  EXPECT_EQ(count(Reason::noStorebag), 1U);
+  EXPECT_EQ(count(Reason::noBackEnds), 2U);
+}
+
+TEST_F(DroppedMessages, CountForMissingNumbers) {
+  configure({"httppost"});
+  send(Dictionary());
+  send(Dictionary{{"Category", 1}});
+  EXPECT_EQ(count(Reason::categoryOrTypeMissing), 2U);
+}
+
+TEST_F(DroppedMessages, CountForEachBackEndWhoseListsRefuseThem) {
+  configure({"httppost", "httppost2", "dashboard"});
+  backend("httppost").setLists(numbers({5}), std::nullopt);
+  backend("httppost2").setLists(std::nullopt, numbers({4}));
+  send(message(4, 1));
+  EXPECT_EQ(count(Reason::eventFiltered), 2U);
+  send(message(5, 1));
+  EXPECT_EQ(count(Reason::eventFiltered), 2U);
+}
+
+TEST_F(DroppedMessages, CountAtTheOtherDoorToo) {
+  sendSingle(Dictionary{{"ClientType", 7}});
+  EXPECT_EQ(count(Reason::identifiersMissing), 1U);
+  sendSingle(sessionInfo());
+  EXPECT_EQ(count(Reason::noStorebag), 1U);
+  delegate_.storebag = Dictionary();
+  sendSingle(sessionInfo());
+  EXPECT_EQ(count(Reason::noBackEnds), 1U);
+  delegate_.storebag = table({"httppost", "httppost2"});
+  factory_.prepare = [](RecordingBackend& made) {
+    if (made.name() == "httppost") made.setLists(numbers({5}), std::nullopt);
+    if (made.name() == "httppost2") made.setLists(std::nullopt, numbers({4}));
+  };
+  sendSingle(sessionInfo());
+  EXPECT_EQ(count(Reason::eventFiltered), 2U);
+}
+
 }  // namespace
 }  // namespace kyt

@@ -375,5 +375,47 @@ TEST_F(ReportingdSessionEnd, LetsGoOfWhatItHeldAlthoughSomebodyStillHoldsTheSess
   EXPECT_TRUE(client_.connection->messagesToClient().empty()) << "nothing is sent after the end";
 }
 
+TEST_F(SessionFixture, CountsKeysOfTheSessionInformationThatMeanNothing) {
+  Dictionary info = sessionInfoAtLevel(0);
+  info.set("RequireUserinfo", true);
+  info.set("clientversion", 3);
+  Dictionary token = *info.find("HierarchyToken")->dictionary();
+  token.set("level", 1);
+  info.set("HierarchyToken", token);
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoKeyUnknown), 3U);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoValueMistyped), 0U);
+  EXPECT_EQ(test_.sink.count(LogLevel::normal,
+                             "setSessionInfo: The session information has an entry RequireUserinfo that "
+                             "means nothing here"),
+            1U);
+  EXPECT_EQ(test_.sink.count("means nothing here"), 1U) << "once a minute";
+}
+
+TEST_F(SessionFixture, CountsValuesOfTheSessionInformationOfAWrongType) {
+  Dictionary info{{"SessionID", "42"},  {"ClientType", true},     {"ClientVersion", Array()},
+                  {"BatchEvent", "on"}, {"RequireUserInfo", "1"}, {"HierarchyToken", 5}};
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoValueMistyped), 6U);
+  EXPECT_EQ(client_.session->sessionID(), 42U) << "it is served all the same";
+  EXPECT_TRUE(logged(LogLevel::normal,
+                     "setSessionInfo: The session information has an entry SessionID of a wrong type"));
+  info = Dictionary{{"SessionID", 42},
+                    {"ClientType", 7U},
+                    {"ClientVersion", 1.0},
+                    {"BatchEvent", 1},
+                    {"RequireUserInfo", false}};
+  client_.session->setSessionInfo(info, std::nullopt, nullptr, false);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoValueMistyped), 6U);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoKeyUnknown), 0U);
+}
+
+TEST_F(SessionFixture, CountsTheInformationOfASingleMessageToo) {
+  Dictionary info = sessionInfo();
+  info.set("Service", "x");
+  client_.session->sendMessageWithSessionInfo(info, std::nullopt, 1, 2, std::nullopt, nullptr);
+  EXPECT_EQ(test_.counters.value(Reason::sessionInfoKeyUnknown), 1U);
+}
+
 }  // namespace
 }  // namespace kyt

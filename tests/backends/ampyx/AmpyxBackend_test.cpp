@@ -53,5 +53,14 @@ TEST_F(Ampyx, RoutedEventsRecordNothing) {
   EXPECT_TRUE(events().empty());
 }
 
+TEST_F(Ampyx, CountsWhatItDoesNotRecord) {
+  record(Dictionary{{"a", 1}}, 0);
+  record(Dictionary{}, 5);
+  backend_->sendMessage(Dictionary{{"a", 1}}, TimeValue{}, 5, 6, MessageFlag{0});
+  EXPECT_EQ(platform_.counters.value(Reason::notForThisBackEnd), 3u);
+  record(Dictionary{{"a", 1}}, 5);
+  EXPECT_EQ(platform_.counters.value(Reason::notForThisBackEnd), 3u);
+}
+
 }  // namespace
 }  // namespace kyt

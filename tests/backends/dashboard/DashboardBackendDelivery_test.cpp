@@ -418,5 +418,57 @@ TEST_F(DashboardDelivery, AReportThatComesAfterTheCleanUpDoesNothing) {
   EXPECT_FALSE(socket().open);
 }
 
+TEST_F(DashboardDelivery, CountsWhatOthersDisplace) {
+  ASSERT_NE(make(reliable()), nullptr);
+  for (uint16_t number = 1; number <= 50; ++number) send(number);
+  EXPECT_EQ(platform_.counters.value(Reason::datagramDisplaced), 0u);
+  for (uint16_t number = 51; number <= 53; ++number) send(number);
+  EXPECT_EQ(platform_.counters.value(Reason::datagramDisplaced), 3u);
+}
+
+TEST_F(DashboardDelivery, CountsWhatNobodyAcknowledges) {
+  ASSERT_NE(make(reliable()), nullptr);
+  send(1);
+  send(2);
+  send(3);
+  acknowledge(2);
+  tick(19);
+  EXPECT_EQ(platform_.counters.value(Reason::datagramUnacknowledged), 0u);
+  tick();
+  EXPECT_EQ(platform_.counters.value(Reason::datagramUnacknowledged), 2u);
+  backend_.reset();
+  EXPECT_EQ(platform_.counters.value(Reason::datagramGivenUp), 0u);
+}
+
+TEST_F(DashboardDelivery, CountsWhatTheLastResortGivesUp) {
+  ASSERT_NE(make(profile()), nullptr);
+  platform_.udpSockets.faults.send = 105;
+  send(1);
+  send(2);
+  backend_->cleanup();
+  tick();
+  tick(1, 9499ms);
+  EXPECT_EQ(platform_.counters.value(Reason::datagramGivenUp), 0u);
+  tick(1, 1ms);
+  EXPECT_EQ(platform_.counters.value(Reason::datagramGivenUp), 2u);
+  send(3);  // after the end
+  backend_.reset();
+  platform_.executor.runAll();
+  EXPECT_EQ(platform_.counters.value(Reason::datagramGivenUp), 3u);
+}
+
+TEST_F(DashboardDelivery, CountsWhatEndsWithItsOwner) {
+  ASSERT_NE(make(reliable()), nullptr);
+  send(1);
+  backend_.reset();
+  EXPECT_EQ(platform_.counters.value(Reason::datagramGivenUp), 1u);
+}
+
+TEST_F(DashboardDelivery, CountsRoutedEventsWhichItDoesNotSend) {
+  ASSERT_NE(make(profile()), nullptr);
+  backend_->KYTReportingBackend::sendMessage({{"k", "v"}}, {1, 0}, 2, 3, MessageFlag{0});
+  EXPECT_EQ(platform_.counters.value(Reason::notForThisBackEnd), 1u);
+}
+
 }  // namespace
 }  // namespace kyt

@@ -399,5 +399,64 @@ TEST_F(HTTPSPostBackendPost, ACompletionMayUseTheStateQueueAgain) {
   EXPECT_EQ(seen, kBackendStateEnabled);
 }
 
+class LostPosts : public HTTPSPostBackendPost {
+ protected:
+  // A flush of three events of which the lists admit two.
+  void flushTwo() {
+    entry_.set("event_blacklist", Array{9});
+    decided();
+    for (const uint16_t method : {1, 2, 9}) send(method);
+    backend().flushMessagesWithCompletion(nullptr);
+  }
+};
+
+TEST_F(LostPosts, CountWithTheirEvents) {
+  flushTwo();
+  poster_->fail(0, Error{kKYTURLErrorDomain, 7, "no connection"});
+  EXPECT_EQ(dropped(Reason::postFailed), 2u);
+  EXPECT_EQ(dropped(Reason::requestFailed), 1u);
+}
+
+TEST_F(LostPosts, CountByWhatTheServerSays) {
+  struct Row {
+    int status;
+    uint64_t redirected, refused;
+  };
+  for (const Row& row : {Row{200, 0, 0}, Row{299, 0, 0}, Row{300, 1, 0}, Row{302, 1, 0}, Row{399, 1, 0},
+                         Row{400, 0, 1}, Row{599, 0, 1}, Row{600, 0, 0}}) {
+    backend_.reset();
+    poster_ = std::make_shared<RecordingPoster>();
+    const uint64_t redirected = dropped(Reason::postRedirected), refused = dropped(Reason::postRefused);
+    const uint64_t requests = dropped(Reason::requestRedirected) + dropped(Reason::requestRefused);
+    flushTwo();
+    poster_->answer(0, row.status);
+    EXPECT_EQ(dropped(Reason::postRedirected) - redirected, 2 * row.redirected) << row.status;
+    EXPECT_EQ(dropped(Reason::postRefused) - refused, 2 * row.refused) << row.status;
+    EXPECT_EQ(dropped(Reason::requestRedirected) + dropped(Reason::requestRefused) - requests,
+              row.redirected + row.refused)
+        << row.status;
+  }
+}
+
+TEST_F(LostPosts, CountWithTheirEventsWhenThereIsNowhereToGo) {
+  entry_.set("post_url", Value());
+  flushTwo();
+  EXPECT_EQ(dropped(Reason::postWithoutURL), 2u);
+  backend_.reset();
+  entry_.set("post_url", "https://post.example.org/events");
+  poster_.reset();
+  flushTwo();
+  EXPECT_EQ(dropped(Reason::postWithoutPoster), 2u);
+}
+
+TEST_F(LostPosts, CountEventsThatLeaveTheirMessageForWantOfAClientID) {
+  entry_.set("extras_on_internal", 1);
+  entry_.set("event_blacklist", Array{9});
+  backend().setIsInternal(true);
+  backend().setUdid(nullptr);
+  flushTwo();
+  EXPECT_EQ(dropped(Reason::postWithoutClientID), 2u);
+}
+
 }  // namespace
 }  // namespace kyt

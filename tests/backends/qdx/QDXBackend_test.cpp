@@ -131,5 +131,19 @@ TEST_F(QDX, AnAdaptorWithoutTheOperationIsNamed) {
                      "selector sendMessageWithMethod:respCode:dict:"));
 }
 
+TEST_F(QDX, CountsEachEventThatItsAdaptorDoesNotTake) {
+  const auto without = make();
+  send(*without);
+  send(*without);
+  EXPECT_EQ(platform_.counters.value(Reason::adaptorUnavailable), 2u);
+  bundles_.present = true;
+  const auto with = make();
+  send(*with);
+  EXPECT_EQ(platform_.counters.value(Reason::adaptorUnavailable), 2u);
+  bundles_.state->operations = {"sendMessage:"};
+  send(*make());
+  EXPECT_EQ(platform_.counters.value(Reason::adaptorUnavailable), 3u);
+}
+
 }  // namespace
 }  // namespace kyt
