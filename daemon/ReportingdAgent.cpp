@@ -36,6 +36,7 @@ bool ReportingdAgent::listenerShouldAcceptNewConnection(Listener& /*listener*/,
     log.debug(
         "listener: new VRP connection %s does not have required kytreporting entitlement. Closing connection...",
         connection->description().c_str());
+    tellRefusal(*connection);
     return false;
   }
   log.debug("listener: Accepting new VRP connection %s as it has proper entitlement, %d(%d) connections.",
@@ -55,6 +56,16 @@ bool ReportingdAgent::listenerShouldAcceptNewConnection(Listener& /*listener*/,
   // A shut-down that began meanwhile may have looked at the list before this session stood in it.
   if (stopping_) connection->finish();
   return true;
+}
+
+// The line above is seen at the debug level alone, where an administrator who misses events does not look.
+void ReportingdAgent::tellRefusal(const Connection& connection) {
+  const Platform& platform = configuration_.platform;
+  const uint32_t user = connection.peerUser();
+  if (platform.log.debugEnabled() || !refusedClients_.mayTell(user, platform.clock.monotonic())) return;
+  platform.log.normal(
+      "listener: Refused connection %s: no grant gives it the entitlement, see \"kytctl entitlements check --user %u\"",
+      connection.description().c_str(), user);
 }
 
 std::shared_ptr<ReportingdSession> ReportingdAgent::createReportingSessionWithDelegate(

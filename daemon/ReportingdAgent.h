@@ -23,6 +23,7 @@
 
 #include "config/Configuration.h"
 #include "daemon/HierarchyGroup.h"
+#include "daemon/RefusedClients.h"
 #include "daemon/SharedDataStore.h"
 #include "platform/Clock.h"
 #include "platform/Mutex.h"
@@ -85,6 +86,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
     uint64_t place = 0;
   };
 
+  void tellRefusal(const Connection& connection);
   void sessionWasInvalidated(const std::shared_ptr<ReportingdSession>& session);
   void removeFromGroups(ReportingdSession& session) REQUIRES(monitor_);
   [[nodiscard]] bool addGroup(const String& token, ReportingdSession& session) REQUIRES(monitor_);
@@ -115,6 +117,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   bool transactionOpen_ GUARDED_BY(monitor_) = false;
 
   // Self-synchronised.
+  RefusedClients refusedClients_;
   std::atomic<size_t> sessionCount_{0};
   std::atomic<size_t> tokenCount_{0};
   std::atomic<bool> stopping_{false};

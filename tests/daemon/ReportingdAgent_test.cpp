@@ -36,6 +36,32 @@ TEST_F(AgentConnections, AConnectionWithoutTheEntitlementIsRefused) {
   EXPECT_EQ(transaction_.begins(), 0);
 }
 
+// At the default level, where an administrator looks for the reason.
+TEST_F(AgentConnections, ARefusalIsToldOnceAMinuteForEachUser) {
+  test_.log.setLevel(LogLevel::normal);
+  const auto refusalsTold = [this](uint32_t user) {
+    test_.sink.clear();
+    EXPECT_FALSE(connect(Value(), user));
+    return test_.sink.lines();
+  };
+  const auto lineFor = [](const char* user) {
+    return std::vector<MemoryLogSink::Line>{
+        {LogLevel::normal,
+         std::string("listener: Refused connection <connection>: no grant gives it the entitlement, see "
+                     "\"kytctl entitlements check --user ") +
+             user + "\""}};
+  };
+  const std::vector<MemoryLogSink::Line> nothing;
+  EXPECT_EQ(refusalsTold(1000), lineFor("1000"));
+  EXPECT_EQ(refusalsTold(1000), nothing);
+  EXPECT_EQ(refusalsTold(0), lineFor("0"));
+  test_.clock.advance(std::chrono::seconds(59));
+  EXPECT_EQ(refusalsTold(1000), nothing);
+  test_.clock.advance(std::chrono::seconds(1));
+  EXPECT_EQ(refusalsTold(1000), lineFor("1000"));
+  EXPECT_TRUE(connect(true, 1000));
+}
+
 TEST_F(AgentConnections, TheTransactionIsOpenWhileASessionIsListed) {
   const Client first = connect();
   EXPECT_TRUE(transaction_.isOpen());

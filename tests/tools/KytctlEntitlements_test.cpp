@@ -112,6 +112,20 @@ TEST_F(KytctlEntitlements, TellsEachCriterionThatDiffersWithWhatTheClientHas) {
   EXPECT_SAYS(run, "    so it does not match\nrefused: no grant matches\n");
 }
 
+TEST_F(KytctlEntitlements, TellsHowNumbersAreWritten) {
+  grant("a.toml", "user = \"" + own() + "\"\ngroup = \"0\"\n" + kYes);
+  const ProgramRun quoted = check({"--user", own()});
+  EXPECT_EQ(quoted.status, 1) << quoted.text;
+  EXPECT_SAYS(quoted, "    user \"" + own() + "\": does not match: there is no such user\n      warning: \"" +
+                          own() + "\" in quotes is a name; a number is written without: user = " + own() +
+                          "\n");
+  EXPECT_SAYS(quoted, "a number is written without: group = 0\n");
+  grant("a.toml", "user = " + own() + "\n" + kYes);
+  const ProgramRun number = check({"--user", own()});
+  EXPECT_EQ(number.status, 0) << number.text;
+  EXPECT_DOES_NOT_SAY(number, "warning");
+}
+
 TEST_F(KytctlEntitlements, CountsSupplementaryGroups) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to give a process groups";
   const ClientProcess client(root_ / "client", [] {

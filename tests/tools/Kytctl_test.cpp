@@ -307,6 +307,42 @@ TEST_F(Kytctl, ShowsGrantsAndWithdrawsConsent) {
   EXPECT_EQ(run({"consent"}).status, 2);
 }
 
+// As somebody who is neither root nor the daemon's user meets them: the folder, or a file in it, is not his to read.
+TEST_F(Kytctl, SaysThatUserDefaultsCannotBeRead) {
+  const std::string root = folder_.path(), state = root + "/var/lib/kytreportingd";
+  ASSERT_EQ(run({"consent", "grant"}).status, 0);
+  const auto asAnybody = [&](std::vector<std::string> arguments) {
+    const TemporaryFolder output;
+    tools::ChildProcess::Options how;
+    how.outputFile = output / "output";
+    if (::geteuid() == 0) how.user = tools::User{"", 54321, 54321};
+    arguments.insert(arguments.begin(), {"--root", root});
+    auto child = tools::ChildProcess::start(kTool, arguments, how);
+    const auto status = child ? child->wait(std::chrono::seconds(60)) : std::nullopt;
+    return ProgramRun{status.value_or(-1), output.read("output")};
+  };
+  ::chmod(root.c_str(), 0755);
+  const std::string file = state + "/defaults/com.vantu.diagnostics.toml";
+  for (const std::string& closed : {state, file}) {
+    ::chmod(closed.c_str(), 0);
+    const ProgramRun shown = asAnybody({"consent", "show"});
+    EXPECT_EQ(shown.status, 1);
+    EXPECT_TRUE(has(shown.text, "consent to diagnostics-and-usage upload: cannot be read\n")) << shown.text;
+    EXPECT_TRUE(has(shown.text, "kytctl: userDefaults: " + file + ": Permission denied")) << shown.text;
+    for (const bool key : {false, true}) {
+      std::vector<std::string> arguments = {"defaults", "read", "com.vantu.diagnostics"};
+      if (key) arguments.emplace_back("consent");
+      const ProgramRun read = asAnybody(arguments);
+      EXPECT_EQ(read.status, 1);
+      EXPECT_TRUE(has(read.text, "Permission denied")) << read.text;
+    }
+    ::chmod(closed.c_str(), closed == state ? 0755 : 0644);
+  }
+  EXPECT_EQ(asAnybody({"consent", "show"}).text, "consent to diagnostics-and-usage upload: granted\n");
+  folder_.write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml", "consent = \n");
+  EXPECT_EQ(asAnybody({"consent", "show"}).status, 1) << "a broken file";
+}
+
 TEST_F(Kytctl, MakesKeysThatOnlyTheirOwnerReads) {
   const ProgramRun made = run({"keys", "make", folder_ / "keys"});
   EXPECT_EQ(made.status, 0) << made.text;

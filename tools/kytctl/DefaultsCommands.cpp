@@ -8,7 +8,6 @@
 #include "platform/Log.h"
 #include "platform/TextEscape.h"
 #include "platform/linux/base/LinuxClock.h"
-#include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/TomlUserDefaults.h"
 #include "tools/kytctl/Commands.h"
 
@@ -16,10 +15,19 @@ namespace kyt::tools {
 
 namespace {
 
+// What the files' reader has to say is the command's own complaint.
+class ComplaintSink final : public LogSink {
+ public:
+  void write(LogLevel /*level*/, std::string_view line) override { failed(std::string(line)); }
+};
+
 struct Defaults {
   explicit Defaults(const std::string& root)
       : defaults({.folder = root + "/var/lib/kytreportingd/defaults"}, log, counters, clock) {}
-  StderrSink sink;
+  // A file that may not be read, or is none, was complained about: what it holds is not known, which is not the same as
+  // having no value.
+  [[nodiscard]] bool unknown() const { return counters.value(Reason::badUserDefaultsFile) != 0; }
+  ComplaintSink sink;
   Log log{sink};
   Counters counters;
   LinuxClock clock;
@@ -74,6 +82,7 @@ int defaultsReadCommand(const std::string& root, const std::string& domain, cons
   Defaults stored(root);
   if (!key.empty()) {
     const Value value = stored.defaults.value(domain, key);
+    if (stored.unknown()) return 1;
     if (value.isNull()) return failed(domain + " has no value for " + key);
     std::printf("%s\n", escapedText(description(value)).c_str());
     return 0;
@@ -81,7 +90,7 @@ int defaultsReadCommand(const std::string& root, const std::string& domain, cons
   for (const DictionaryEntry& entry : stored.defaults.values(domain))
     std::printf("%s = %s (%s)\n", escapedText(entry.key.view()).c_str(),
                 escapedText(description(entry.value)).c_str(), kindName(entry.value));
-  return 0;
+  return stored.unknown() ? 1 : 0;
 }
 
 int defaultsWriteCommand(const std::string& root, const std::string& domain, const std::string& key,
@@ -105,8 +114,11 @@ int consentCommand(const std::string& root, const std::string& change) {
       return failed(*error);
   }
   const bool granted = stored.defaults.value(kDiagnosticsDefaultsDomain, "consent").boolValue();
-  std::printf("consent to diagnostics-and-usage upload: %s\n", granted ? "granted" : "not given");
-  return 0;
+  const bool known = !stored.unknown();
+  std::printf("consent to diagnostics-and-usage upload: %s\n", !known    ? "cannot be read"
+                                                               : granted ? "granted"
+                                                                         : "not given");
+  return known ? 0 : 1;
 }
 
 }  // namespace kyt::tools

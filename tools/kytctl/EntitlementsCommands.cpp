@@ -140,9 +140,11 @@ class Check {
     if (grant.user)
       tell("user " + text(*grant.user), match_.isUser(*grant.user),
            userNumber(*grant.user) ? "the client is " + userText(client_.peer.uid) : "there is no such user");
+    if (grant.user) noteDigits("user", *grant.user);
     if (grant.group)
       tell("group " + text(*grant.group), match_.isMember(*grant.group),
            groupNumber(*grant.group) ? "the client is in " + client_.groupsText() : "there is no such group");
+    if (grant.group) noteDigits("group", *grant.group);
     if (grant.securityLabel) label(*grant.securityLabel);
     if (grant.executable) executable(*grant.executable);
     return answer_;
@@ -204,6 +206,14 @@ class Check {
            text(result.running) + "), this is " + text(result.wanted) +
            (replaced ? ". The client's file was replaced or removed since it was started: start it again"
                      : "");
+  }
+
+  // A number in quotes is a name, which hardly anybody has.
+  static void noteDigits(const char* key, const NameOrNumber& who) {
+    const auto* const name = std::get_if<std::string>(&who);
+    if (name == nullptr || name->find_first_not_of("0123456789") != std::string::npos) return;
+    say("      warning: \"%s\" in quotes is a name; a number is written without: %s = %s", name->c_str(), key,
+        name->c_str());
   }
 
   void noteHidden(const std::string& path) const {
