@@ -175,6 +175,9 @@ TEST_F(KYTReportingBackendTest, DrawsOneOf101SamplingFactors) {
   platform_.random.setDraw(100);
   EXPECT_EQ(KYTReportingBackend::initWithName(platform_.platform, "a", {}, std::nullopt)->samplingFactor(),
             1.0);
+  const std::vector<uint32_t> bounds = platform_.random.bounds();
+  ASSERT_GE(bounds.size(), 3u);
+  for (const uint32_t bound : bounds) EXPECT_EQ(bound, 101u);
 }
 
 TEST_F(KYTReportingBackendTest, TheBaseAloneDoesNothing) {

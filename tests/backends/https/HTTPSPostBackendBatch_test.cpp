@@ -384,6 +384,62 @@ TEST_F(HTTPSPostBackendBatch, ANewSessionIDIsWrittenIntoTheBatch) {
   backend().setCorrelatedSessionID("13.77");  // without a batch
 }
 
+// New records of such a client have their session's number; those in the batch get the text all the same.
+TEST_F(HTTPSPostBackendBatch, ANewSessionIDReplacesTheNumberOfAClientThatSendsNumbers) {
+  inState(kBackendStateEnabled);
+  backend().setCompType(7);
+  send(5);
+  backend().setCorrelatedSessionID("12.77");
+  send(6);
+  flush();
+  EXPECT_EQ(*events(0).at(0).find("_sessionID"), Value("12.77"));
+  EXPECT_EQ(*events(0).at(1).find("_sessionID"), Value(77));
+}
+
+TEST_F(HTTPSPostBackendBatch, CountsARecordByTheMethodThatSharedDataGaveIt) {
+  entry_.set("event_threshold", 1);
+  inState(kBackendStateEnabled);
+  for (const uint16_t method : {5, 6, 7}) {
+    EXPECT_TRUE(poster_->requests.empty());
+    backend().sendMessage({{kKYTReportingMessageBlobClientData, Dictionary()},
+                           {kKYTReportingMessageBlobSharedData, Dictionary{{"_method", 9}}}},
+                          {1000000025, 0}, method, 2, MessageFlag{});
+  }
+  ASSERT_EQ(poster_->requests.size(), 1u) << "the third of method 9";
+  EXPECT_EQ(events(0).size(), 2u);
+  EXPECT_TRUE(logged(
+      "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method 9"));
+}
+
+TEST_F(HTTPSPostBackendBatch, AListSeesTheMethodThatUserInformationGaveARecord) {
+  userInfo_->set("_method", 9);
+  entry_.set("event_blacklist", Array{9});
+  inState(kBackendStateEnabled);
+  send(5);
+  EXPECT_EQ(flush().error->localizedDescription,
+            "Nothing to flush: batched events were completely filtered out");
+  EXPECT_TRUE(logged(
+      "flushMessagesWithCompletion: Dropping event with category 9 as it is blacklisted for backend httppost"));
+  backend_.reset();
+  entry_.set("event_blacklist", Array{5});
+  inState(kBackendStateEnabled);
+  send(5);
+  EXPECT_EQ(postedRecords(), 1u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AListSeesTheMethodFromBeforeTheFlushMergedUserInformation) {
+  userInfo_ = std::nullopt;
+  entry_.set("event_whitelist", Array{5});
+  inState(kBackendStateEnabled);
+  send(5);
+  backend().setUserInfoDict(Dictionary{
+      {kKYTReportingUserInfoClientName, "a"}, {kKYTReportingUserInfoServiceName, "b"}, {"_method", 9}});
+  backend().updateState();
+  flush();
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(*events(0).at(0).find("_method"), Value(9));
+}
+
 TEST_F(HTTPSPostBackendBatch, ReportsTheSizeOfItsRecords) {
   inState(kBackendStateEnabled);
   EXPECT_EQ(backend().batchedEventsSize(), 0u);

@@ -66,6 +66,33 @@ TEST_F(HTTPSPostBackendPost, TheClientIDFollowsTheEntry) {
   EXPECT_EQ(clientID(), Value("0123456789012345678901234567890123456789"));
 }
 
+TEST_F(HTTPSPostBackendPost, WithoutConsentTheClientIDIsTheOneOfEntriesThatOverrideIt) {
+  platform_.consent.setAllowed(false);
+  entry_.set("override_dnu", 1);
+  sending();
+  send(5);
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidOverrideDnu"));
+  EXPECT_NE(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidRespectDnu"));
+}
+
+TEST_F(HTTPSPostBackendPost, AnyValueButZeroOfExtrasOnInternalSendsTheDevicesIdentifier) {
+  for (const Value& value : {Value(2), Value(-1), Value(256), Value("3")}) {
+    entry_.set("extras_on_internal", value);
+    backend_.reset();
+    sending();
+    backend().setIsInternal(true);
+    send(5);
+    EXPECT_EQ(clientID(), Value("0123456789012345678901234567890123456789")) << description(value);
+  }
+  entry_.set("extras_on_internal", 0);
+  backend_.reset();
+  sending();
+  backend().setIsInternal(true);
+  send(5);
+  EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidRespectDnu"));
+}
+
 TEST_F(HTTPSPostBackendPost, WithoutAClientIDCarriesItsTimeAlone) {
   entry_.set("extras_on_internal", 1);
   sending();

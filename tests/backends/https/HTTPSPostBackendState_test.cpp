@@ -136,6 +136,25 @@ TEST_F(HTTPSPostBackendState, ExpediteZeroBatches) {
   EXPECT_TRUE(logged("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=1"));
 }
 
+TEST_F(HTTPSPostBackendState, AnyOtherValueOfExpediteDoesNotBatch) {
+  for (const Value& value : {Value(2), Value(-1), Value(256), Value("3"), Value(true)}) {
+    entry_.set("expedite", value);
+    make({entry_}).updateState();
+    EXPECT_FALSE(backend().batchEvents()) << description(value);
+  }
+}
+
+TEST_F(HTTPSPostBackendState, AnyValueButZeroKeepsPostsOffCellularNetworks) {
+  for (const Value& value : {Value(1), Value(2), Value(-1), Value(256), Value("3")}) {
+    entry_.set("use_wifi_only", value);
+    make({entry_}).updateState();
+    EXPECT_TRUE(backend().shouldUseWiFiOnly()) << description(value);
+  }
+  entry_.set("use_wifi_only", 0);
+  make({entry_}).updateState();
+  EXPECT_FALSE(backend().shouldUseWiFiOnly());
+}
+
 TEST_F(HTTPSPostBackendState, ASessionThatNeedsNoUserInformationIsEnabledWhateverTheRules) {
   platform_.consent.setAllowed(false);
   userInfo_ = std::nullopt;
@@ -247,6 +266,28 @@ TEST_F(HTTPSPostBackendState, NeedsFilters) {
 TEST_F(HTTPSPostBackendState, EmptyFiltersAreFilters) {
   entry_.set("filters", Array{});
   EXPECT_EQ(decide(), kBackendStateEnabled);
+}
+
+TEST_F(HTTPSPostBackendState, FiltersAreThereWhateverTheSamplingDecides) {
+  entry_.remove("sampling_threshold");
+  EXPECT_EQ(decide(), kBackendStateDisabled);
+  EXPECT_EQ(backend().numberOfFilters(), 1);
+  platform_.random.setDraw(50);
+  entry_.set("sampling_threshold", 0.1);
+  backend_.reset();
+  EXPECT_EQ(decide(), kBackendStateHeld);
+  EXPECT_EQ(backend().numberOfFilters(), 1);
+  backend().setState(kBackendStateHeld);
+  send(5, {{"secret", "s"}, {"k", 1}});
+  backend().setState(kBackendStateEnabled);
+  backend().flushMessagesWithCompletion(nullptr);
+  EXPECT_FALSE(events(0).at(0).contains("secret")) << "filtered when it was made, not only when it left";
+}
+
+TEST_F(HTTPSPostBackendState, ARuleThatDisablesBuildsNoFilters) {
+  entry_.set("device_whitelist", Array{"Tablet"});
+  EXPECT_EQ(decide(), kBackendStateDisabled);
+  EXPECT_EQ(backend().numberOfFilters(), 0);
 }
 
 struct Draw {
@@ -426,38 +467,6 @@ TEST_F(HTTPSPostBackendState, FollowsTheUserInformation) {
   backend().setUserInfoDict(userInfo_);
   backend().updateState();
   EXPECT_EQ(backend().state(), kBackendStateEnabled);
-}
-
-// What a decision leaves behind must not decide for the next client: entry "a" first, then entry "c".
-class HTTPSPostBackendNextClient : public HTTPSPostBackendState {
- protected:
-  HTTPSPostBackendNextClient() { next_.set("client", "c"); }
-  int32_t decideForBoth() {
-    make({entry_, next_}).updateState();
-    backend().setUserInfoDict(
-        Dictionary{{kKYTReportingUserInfoClientName, "c"}, {kKYTReportingUserInfoServiceName, "b"}});
-    return decide();
-  }
-  Dictionary next_ = entry_;
-};
-
-TEST_F(HTTPSPostBackendNextClient, RespectsTheConsentAgain) {
-  entry_.set("override_dnu", 1);
-  decideForBoth();
-  EXPECT_EQ(backend().dnuType(), 0);
-}
-
-TEST_F(HTTPSPostBackendNextClient, HasNoOverrideOfTheSampling) {
-  platform_.random.setDraw(50);
-  for (Dictionary* entry : {&entry_, &next_}) entry->set("sampling_threshold", 0.1);
-  entry_.set("override_sampling", 0.2);
-  EXPECT_EQ(decideForBoth(), kBackendStateHeld);
-}
-
-TEST_F(HTTPSPostBackendNextClient, MayUseCellularAccessAgain) {
-  entry_.set("use_wifi_only", 1);
-  decideForBoth();
-  EXPECT_FALSE(backend().shouldUseWiFiOnly());
 }
 
 TEST_F(HTTPSPostBackendState, ABackEndThatSamplingDisablesTakesTheSettingsToo) {
