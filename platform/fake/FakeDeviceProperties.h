@@ -2,6 +2,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <limits>
 #include <map>
 #include <optional>
@@ -34,6 +35,8 @@ class FakeDeviceProperties final : public DeviceProperties {
     later_ = seconds;
     laterFrom_ = from;
   }
+  // Called for each question, by the thread that asks, before the answer. Set before anybody asks.
+  void setOnQuery(std::function<void(std::string_view key)> onQuery) { onQuery_ = std::move(onQuery); }
   // How often that property was asked for.
   [[nodiscard]] int queries(std::string_view key) const EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
@@ -42,6 +45,7 @@ class FakeDeviceProperties final : public DeviceProperties {
   }
 
   [[nodiscard]] std::optional<String> property(std::string_view key) override EXCLUDES(mutex_) {
+    if (onQuery_) onQuery_(key);
     MutexLock lock(mutex_);
     ++queries_[std::string(key)];
     auto found = properties_.find(std::string(key));
@@ -62,6 +66,7 @@ class FakeDeviceProperties final : public DeviceProperties {
   std::map<std::string, std::string> properties_ GUARDED_BY(mutex_);
   std::map<std::string, int> queries_ GUARDED_BY(mutex_);
   std::optional<std::string> country_ GUARDED_BY(mutex_);
+  std::function<void(std::string_view)> onQuery_;
   std::atomic<int64_t> secondsFromGMT_ = 0, later_ = 0;
   std::atomic<int64_t> laterFrom_ = std::numeric_limits<int64_t>::max();
 };

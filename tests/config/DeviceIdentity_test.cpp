@@ -2,11 +2,16 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
+#include <atomic>
 #include <cstring>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
+#include "platform/Semaphore.h"
+#include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {
@@ -81,6 +86,32 @@ TEST(DeviceIdentity, AsksForTheReleaseTypeOnce) {
   test.deviceProperties.setProperty("ReleaseType", "Internal");
   EXPECT_FALSE(test.deviceIdentity.isInternalBuild());
   EXPECT_EQ(test.deviceProperties.queries("ReleaseType"), 1);
+}
+
+// Each caller gets the answer of the device, also one that comes while the first is still asking.
+TEST(DeviceIdentity, AsksForTheReleaseTypeOnceUnderConcurrentFirstCalls) {
+  constexpr int kCallers = 4;
+  TestPlatform test;
+  test.deviceProperties.setProperty("ReleaseType", "Internal");
+  Semaphore released(0);
+  std::atomic<int> asked = 0, calling = 0;
+  test.deviceProperties.setOnQuery([&](std::string_view) {
+    ++asked;
+    released.wait();
+  });
+  std::array<bool, kCallers> answers{};
+  {
+    std::vector<std::jthread> threads;
+    for (bool& answer : answers)
+      threads.emplace_back([&] {
+        ++calling;
+        answer = test.deviceIdentity.isInternalBuild();
+      });
+    EXPECT_TRUE(eventually([&] { return calling == kCallers && asked >= 1; }));
+    for (int i = 0; i < kCallers; ++i) released.signal();
+  }
+  for (const bool answer : answers) EXPECT_TRUE(answer);
+  EXPECT_EQ(asked, 1);
 }
 
 TEST(DeviceIdentity, KeepsOneInstanceUUIDUnderConcurrentFirstCalls) {
