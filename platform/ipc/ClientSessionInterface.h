@@ -55,7 +55,8 @@ class ClientSessionReplyInterface {
   virtual ~ClientSessionReplyInterface() = default;
   // One way. An error means that the message cannot reach the client (it is gone, or the message is too
   // large). One that is dropped because the client reads too slowly is counted there, and is no error: there
-  // may be thousands a second, and each error is a log line.
+  // may be thousands a second, and each error is a log line. The all-zero message without objects, which ends an
+  // aggregation, is never dropped.
   [[nodiscard]] virtual std::optional<Error> sendMessageToClient(std::optional<Dictionary> sessionInfo,
                                                                  double timestamp, uint16_t category,
                                                                  uint16_t type,

@@ -9,7 +9,7 @@ constexpr size_t kMostHeldBytes = 65536;  // a turn's replies beyond that do not
 
 }  // namespace
 
-ConnectionOutput::Sent ConnectionOutput::send(Builder build, bool droppable) {
+ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
   Event event = Event::none;
   {
     MutexLock lock(mutex_);
@@ -19,11 +19,11 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, bool droppable) {
     if (++lastSerial_ == 0) ++lastSerial_;
     MessageWriter writer(queue);
     if (!build(writer, lastSerial_)) return Sent::refused;
-    if (droppable && waitingBytes() > maxQueuedBytes_) {
+    if (kind == Kind::droppable && waitingBytes() > maxQueuedBytes_) {
       queue.resize(before);
       return Sent::queueFull;
     }
-    event = queued();
+    event = queued(kind);
   }
   tell(event);
   return Sent::yes;
@@ -52,13 +52,13 @@ void ConnectionOutput::open() {
   tell(event);
 }
 
-ConnectionOutput::Event ConnectionOutput::queued() {
+ConnectionOutput::Event ConnectionOutput::queued(Kind kind) {
   Event event = Event::none;
   const bool mayHold = held_ && waitingBytes() < kMostHeldBytes && waitingBytes() <= maxQueuedBytes_;
   if (!waiting_ && !mayHold) event = flush();
   const size_t left = waitingBytes();
   if (event == Event::broken || left <= maxQueuedBytes_) return event;
-  if (left > 2 * maxQueuedBytes_) {
+  if (left > 2 * maxQueuedBytes_ && kind != Kind::vital) {
     dead_ = true;
     pending_ = std::string();
     written_ = 0;

@@ -36,15 +36,21 @@ class ConnectionOutput {
   ConnectionOutput(Stream& stream, std::weak_ptr<Observer> observer, uint64_t maxQueuedBytes)
       : stream_(&stream), observer_(std::move(observer)), maxQueuedBytes_(maxQueuedBytes) {}
 
-  // Writes one whole message; answers what the writer's end() said.
+  enum class Kind : uint8_t {
+    ordinary,
+    droppable,  // not sent where it would pass the limit
+    vital,  // sent past every limit, and never the reason why the connection ends: the caller sees to it that
+            // such messages are few
+  };
   using Builder = Function<bool(MessageWriter&, uint32_t serial)>;
   enum class Sent : uint8_t {
     yes,
     closed,     // nobody is there any more
     refused,    // it cannot be written as a message: too long, or nested too deeply
-    queueFull,  // `droppable`, and it would have passed the limit
+    queueFull,  // it is droppable, and would have passed the limit
   };
-  Sent send(Builder build, bool droppable = false);
+  // Writes one whole message.
+  Sent send(Builder build, Kind kind = Kind::ordinary);
   // The handshake's answers, which come before every message: those that are sent earlier wait for open().
   void sendHandshake(std::string_view bytes);
   void open();
@@ -72,7 +78,7 @@ class ConnectionOutput {
     broken
   };
   Event flush() REQUIRES(mutex_);
-  Event queued() REQUIRES(mutex_);
+  Event queued(Kind kind = Kind::ordinary) REQUIRES(mutex_);
   [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) {
     return pending_.size() - written_ + early_.size();
   }

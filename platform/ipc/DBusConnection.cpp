@@ -225,6 +225,9 @@ void DBusConnection::outputBroken() {
 std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionary> sessionInfo,
                                                          double timestamp, uint16_t category, uint16_t type,
                                                          std::optional<Dictionary> payload) {
+  // The end of an aggregation. A client that missed it would wait for messages for ever. There is at most one for
+  // each time that the client asks for aggregation, and while its output is full it is not heard.
+  const bool isEnd = !sessionInfo && timestamp == 0 && category == 0 && type == 0 && !payload;
   const auto sent = output_->send(
       [&](MessageWriter& out, uint32_t serial) {
         out.beginCall(serial, {.path = wire::kClientPath,
@@ -239,7 +242,7 @@ std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionar
         out.writeOptionalDictionary(payload);
         return out.end();
       },
-      true);
+      isEnd ? ConnectionOutput::Kind::vital : ConnectionOutput::Kind::droppable);
   switch (sent) {
     case ConnectionOutput::Sent::yes:
       return std::nullopt;

@@ -426,6 +426,28 @@ TEST_F(DBusConnectionTest, NothingIsKeptForAClientThatPassedTwiceTheLimit) {
   EXPECT_TRUE(pipe_->closed);
 }
 
+// Others end a session's aggregation: what they send must not cut it off.
+TEST_F(DBusConnectionTest, TheMessageThatEndsAnAggregationEndsNoConnection) {
+  shakeHands();
+  pipe_->room = 0;
+  std::string call;
+  MessageWriter writer(call);
+  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
+  ASSERT_TRUE(writer.end());
+  say(call);
+  executor_.runAll();
+  ASSERT_EQ(session_->held.size(), 1u);
+  session_->held[0](Array{std::string(39880, 'x')});  // nearly twice the limit
+  EXPECT_FALSE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 0, 0, std::nullopt));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 0);
+  pipe_->room = SIZE_MAX;
+  ASSERT_TRUE(reactor_.report(kStream, ready::writable));
+  executor_.runAll();
+  EXPECT_GT(pipe_->fromServer.size(), 40000u) << "or there was room for it";
+  EXPECT_NE(pipe_->fromServer.find("SendMessageToClient"), std::string::npos);
+}
+
 // At the deadline of a shut-down.
 TEST_F(DBusConnectionTest, InvalidatingEndsTheWaitOfAFinishedConnectionToBeWritten) {
   shakeHands();

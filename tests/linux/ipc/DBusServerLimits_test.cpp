@@ -81,6 +81,40 @@ TEST(DBusServer, DropsMessagesToAClientThatReadsTooSlowlyAndKeepsIt) {
   EXPECT_EQ(server.invalidations, 0);
 }
 
+// Without it the client would go on waiting for messages that nobody sends any more.
+TEST(DBusServer, NeverDropsTheMessageThatEndsAnAggregation) {
+  Limits limits;
+  limits.maxQueuedBytes = 100000;
+  Server server(limits);
+  PlainClient client(server.path);
+  ASSERT_TRUE(client.shakeHands());
+  auto& proxy = server.session()->connection().remoteObjectProxy();
+  // The smallest messages last, so that there is no room left for any.
+  int sent = 0;
+  for (const size_t bytes : {20000u, 1000u, 1u}) {
+    const Dictionary payload{{"text", std::string(bytes, 'x')}};
+    const uint64_t dropped = server.counted(Reason::aggregatorMessageDropped);
+    for (; sent < 10000 && server.counted(Reason::aggregatorMessageDropped) == dropped; ++sent)
+      ASSERT_FALSE(proxy.sendMessageToClient(std::nullopt, 5, 1, 2, payload));
+    --sent;  // the dropped one
+  }
+  ASSERT_EQ(server.counted(Reason::aggregatorMessageDropped), 3u);
+  EXPECT_FALSE(proxy.sendMessageToClient(std::nullopt, 0, 0, 0, std::nullopt));
+  EXPECT_EQ(server.counted(Reason::aggregatorMessageDropped), 3u);
+  for (int i = 0; i < sent; ++i) ASSERT_TRUE(client.receive()) << i;
+  const auto last = client.receive();
+  ASSERT_TRUE(last);
+  BodyReader in(*last);
+  std::optional<Dictionary> info;
+  double timestamp = 1;
+  uint16_t category = 1, type = 1;
+  EXPECT_TRUE(in.readOptionalDictionary(info) && in.readDouble(timestamp) && in.readUInt16(category) &&
+              in.readUInt16(type));
+  EXPECT_EQ(timestamp, 0);
+  EXPECT_EQ(category + type, 0);
+  EXPECT_EQ(server.invalidations, 0);
+}
+
 TEST(DBusServer, AClientThatReadsNothingAndClosesIsEndedWithoutSpinning) {
   Limits limits;
   limits.maxQueuedBytes = 100000;
