@@ -8,7 +8,6 @@
 
 #include "config/ClientTypes.h"
 #include "config/Environment.h"
-#include "platform/Cryptography.h"
 #include "platform/DataServices.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
@@ -60,10 +59,30 @@ const Dictionary* sectionEntry(const Dictionary& bag, const std::optional<String
   return value != nullptr ? value->dictionary() : nullptr;
 }
 
-std::optional<Data> decodedEntry(const Dictionary& dictionary, const char* key) {
+std::optional<Data> decodedEntry(const Dictionary& dictionary, const char* key, Log& log) {
   const String* text = stringEntry(dictionary, key);
-  if (text == nullptr) return std::nullopt;
-  return base64Decode(*text);
+  std::optional<Data> bytes;
+  if (text == nullptr)
+    log.normal("fetchStorebagWithName: The storebag's \"%s\" is missing or no text", key);
+  else if (bytes = base64Decode(*text); !bytes)
+    log.normal("fetchStorebagWithName: The storebag's \"%s\" is no base64", key);
+  return bytes;
+}
+
+// The dictionary that the signed bytes are; none with its reason in the log.
+std::optional<Dictionary> signedContents(const Data& bag, PropertyLists& propertyLists, Log& log) {
+  const std::variant<Value, Error> content = propertyLists.parse(bag.view());
+  if (const Error* error = std::get_if<Error>(&content)) {
+    log.normal("fetchStorebagWithName: What the storebag's signature covers is no property list: %s",
+               error->localizedDescription.c_str());
+    return std::nullopt;
+  }
+  const Dictionary* dictionary = std::get<Value>(content).dictionary();
+  if (dictionary == nullptr) {
+    log.normal("fetchStorebagWithName: What the storebag's signature covers is no dictionary");
+    return std::nullopt;
+  }
+  return *dictionary;
 }
 
 }  // namespace
@@ -111,7 +130,43 @@ std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::opti
     *lastModified = String(*modified);
     log.debug("fetchStorebagWithName: New 'Last-Modified: %s' received", (*lastModified)->c_str());
   }
-  return verifiedBag(reply);
+  std::optional<Dictionary> bag = verifiedBag(reply);
+  // The status decides nothing, but an error page is no storebag, and then it is the reason that helps.
+  const int status = reply.response->status;
+  if (!bag && (status < 200 || status > 299))
+    log.normal("fetchStorebagWithName: %s answered with status %d", address.c_str(), status);
+  return bag;
+}
+
+std::vector<std::unique_ptr<PublicKey>> StorebagFetcher::publicKeys() const {
+  const Platform& platform = configuration_.platform;
+  std::vector<std::unique_ptr<PublicKey>> keys;
+  bool isThere = false;
+  for (const char* name : {"publicKey", "publicKey2"}) {
+    const std::optional<Data> der = platform.clientBundle.resource(name, "der");
+    if (!der) continue;
+    isThere = true;
+    if (auto key = platform.cryptography.publicKeyFromDER(der->bytes()))
+      keys.push_back(std::move(key));
+    else if (der->view().starts_with("-----BEGIN"))
+      platform.log.normal("fetchStorebagWithName: The bundle's %s.der is PEM, not DER", name);
+    else
+      platform.log.normal("fetchStorebagWithName: The bundle's %s.der is no RSA public key in DER", name);
+  }
+  if (!isThere)
+    platform.log.normal("fetchStorebagWithName: The bundle has no publicKey.der that could be read");
+  return keys;
+}
+
+bool StorebagFetcher::verifies(const Data& bag, const Data& signature) const {
+  const std::vector<std::unique_ptr<PublicKey>> keys = publicKeys();
+  if (keys.empty()) return false;
+  const auto digest = configuration_.platform.cryptography.sha1(bag.bytes());
+  for (const auto& key : keys)
+    if (key->verifySHA1(digest, signature.bytes())) return true;
+  configuration_.platform.log.error("fetchStorebagWithName: Signature can not be verified, %p",
+                                    static_cast<const void*>(keys.front().get()));
+  return false;
 }
 
 std::optional<Dictionary> StorebagFetcher::verifiedBag(const Reply& reply) {
@@ -128,23 +183,10 @@ std::optional<Dictionary> StorebagFetcher::verifiedBag(const Reply& reply) {
     return std::nullopt;
   }
 
-  const std::optional<Data> der = configuration_.platform.clientBundle.resource("publicKey", "der");
-  const std::unique_ptr<PublicKey> key =
-      der ? configuration_.platform.cryptography.publicKeyFromDER(der->bytes()) : nullptr;
-  if (key == nullptr) return std::nullopt;
-  const std::optional<Data> signature = decodedEntry(*dictionary, "signature");
-  const std::optional<Data> bag = decodedEntry(*dictionary, "bag");
-  if (!signature || !bag) return std::nullopt;
-  if (!key->verifySHA1(configuration_.platform.cryptography.sha1(bag->bytes()), signature->bytes())) {
-    log.error("fetchStorebagWithName: Signature can not be verified, %p",
-              static_cast<const void*>(key.get()));
-    return std::nullopt;
-  }
-
-  std::variant<Value, Error> content = propertyLists.parse(bag->view());
-  const Value* contentRoot = std::get_if<Value>(&content);
-  if (contentRoot == nullptr || !contentRoot->isDictionary()) return std::nullopt;
-  return *contentRoot->dictionary();
+  const std::optional<Data> signature = decodedEntry(*dictionary, "signature", log);
+  const std::optional<Data> bag = decodedEntry(*dictionary, "bag", log);
+  if (!signature || !bag || !verifies(*bag, *signature)) return std::nullopt;
+  return signedContents(*bag, propertyLists, log);
 }
 
 std::optional<Dictionary> StorebagFetcher::fetchStorebagForEnvironmentAndClientType(
@@ -182,7 +224,12 @@ std::optional<Dictionary> StorebagFetcher::fetchStorebagForEnvironmentAndClientT
 
   // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
   const String* bagVersion = stringEntry(*bag, "version");
-  if (bagVersion == nullptr) return std::nullopt;
+  if (bagVersion == nullptr) {
+    log.normal(
+        "fetchStorebagForEnvironmentAndClientType: The storebag for client type %d has no text \"version\"",
+        clientType);
+    return std::nullopt;
+  }
   version = *bagVersion;
   if (const Value* refreshCycle = bag->find("refresh_cycle")) {
     maxAge = std::min(refreshCycle->intValue(), kMaxStorebagAge);

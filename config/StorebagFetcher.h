@@ -6,15 +6,20 @@
 // A fetch blocks its thread until the reply is there, at most 15 seconds, or until the shut-down cancels what
 // threads wait for; then none can begin any more. The requests of the whole process
 // go through one URL session, made at first use while holding the lock of the class KYTReportingBackend,
-// which the composition root owns. Every failure is an absent result and one log line at most; nothing here
-// is fatal.
+// which the composition root owns. Every failure is an absent result and log lines that tell its cause at the default
+// level; nothing here is fatal.
+//
+// The keys are read at each download: "publicKey.der" of the client framework's bundle and, where it is there,
+// "publicKey2.der" beside it. A bag that either verifies counts, so that keys are replaced by having both for a while.
 #pragma once
 
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <vector>
 
 #include "config/Configuration.h"
+#include "platform/Cryptography.h"
 #include "platform/Mutex.h"
 #include "platform/UrlSession.h"
 #include "platform/Value.h"
@@ -52,6 +57,8 @@ class StorebagFetcher {
   Reply sendSynchronousRequest(URLRequest request);
   URLSession& urlSession();
   std::optional<Dictionary> verifiedBag(const Reply& reply);
+  [[nodiscard]] std::vector<std::unique_ptr<PublicKey>> publicKeys() const;
+  [[nodiscard]] bool verifies(const Data& bag, const Data& signature) const;
 
   Configuration configuration_;
   Mutex& backendClassLock_;

@@ -39,7 +39,7 @@ class MemoryInfo {
   [[nodiscard]] virtual uint64_t internalMemory() = 0;
 };
 
-// A bundle: a folder with info.toml and resources, read at start-up.
+// A bundle: a folder with info.toml, read at start-up, and resources, each read when it is asked for.
 class Bundle {
  public:
   virtual ~Bundle() = default;

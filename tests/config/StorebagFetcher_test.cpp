@@ -193,7 +193,7 @@ TEST_F(StorebagFetcherTest, TakesAWrongTypeForAMissingSignature) {
   EXPECT_TRUE(test_.sink.contains(LogLevel::error, "fetchStorebagWithName: Signature is missing"));
 }
 
-TEST_F(StorebagFetcherTest, FailsSilentlyWithoutAPublicKey) {
+TEST_F(StorebagFetcherTest, ReportsNoErrorWithoutAPublicKey) {
   serveBag(bag_);
   test_.clientBundle.removeResource("publicKey", "der");
   EXPECT_FALSE(fetch());
@@ -202,7 +202,7 @@ TEST_F(StorebagFetcherTest, FailsSilentlyWithoutAPublicKey) {
   EXPECT_EQ(test_.sink.count(LogLevel::error, "fetchStorebagWithName"), 0U);
 }
 
-TEST_F(StorebagFetcherTest, FailsSilentlyWhenBase64CannotBeDecoded) {
+TEST_F(StorebagFetcherTest, ReportsNoErrorWhenBase64CannotBeDecoded) {
   serve({200,
          {},
          test_.propertyLists.serialize(Dictionary{{"signature", "A"}, {"bag", "AAAA"}}),
@@ -318,6 +318,101 @@ TEST_F(StorebagFetcherTest, TheShutDownEndsADownloadUnderWayAndLetsNoOtherBegin)
   serveBag(bag_);
   EXPECT_FALSE(fetch());
   EXPECT_EQ(test_.urlSessions.figures().completed, 0U);
+}
+
+// Each failure says its cause at the default level.
+class StorebagFailures : public StorebagFetcherTest {
+ protected:
+  void expectReason(const std::string& reason) {
+    test_.sink.clear();
+    EXPECT_FALSE(fetchSection());
+    EXPECT_EQ(test_.sink.count(LogLevel::normal, reason), 1U) << reason;
+  }
+  void serveDocument(const Dictionary& document) {
+    serve({200, {}, test_.propertyLists.serialize(document), std::nullopt});
+  }
+};
+
+TEST_F(StorebagFailures, NameTheStatusOfAnErrorPage) {
+  for (const int status : {404, 503, 304}) {
+    serve({status, {}, "<html>not here</html>", std::nullopt});
+    expectReason(std::string("fetchStorebagWithName: ") + kURL + "/torvel?version=8.0 answered with status " +
+                 std::to_string(status));
+    EXPECT_TRUE(test_.sink.contains(LogLevel::error, "fetchStorebagWithName: Signature is missing"));
+  }
+  serve({200, {}, "<html>not here</html>", std::nullopt});
+  test_.sink.clear();
+  EXPECT_FALSE(fetchSection());
+  EXPECT_EQ(test_.sink.count("status"), 0U);
+  serve({503, {}, signedBag(bag_, test_.propertyLists), std::nullopt});
+  EXPECT_TRUE(fetchSection());
+  EXPECT_EQ(test_.sink.count("status"), 0U);
+}
+
+TEST_F(StorebagFailures, NameAMissingKey) {
+  serveBag(bag_);
+  test_.clientBundle.removeResource("publicKey", "der");
+  expectReason("fetchStorebagWithName: The bundle has no publicKey.der that could be read");
+}
+
+TEST_F(StorebagFailures, NameAKeyOfAnotherForm) {
+  serveBag(bag_);
+  test_.clientBundle.setResource("publicKey", "der", Data("-----BEGIN PUBLIC KEY-----\n"));
+  expectReason("fetchStorebagWithName: The bundle's publicKey.der is PEM, not DER");
+  test_.clientBundle.setResource("publicKey", "der", Data("no key"));
+  expectReason("fetchStorebagWithName: The bundle's publicKey.der is no RSA public key in DER");
+}
+
+TEST_F(StorebagFailures, NameWhatIsNoBase64) {
+  serveDocument(Dictionary{{"signature", "A"}, {"bag", "AAAA"}});
+  expectReason("fetchStorebagWithName: The storebag's \"signature\" is no base64");
+  serveDocument(Dictionary{{"signature", "AAAA"}, {"bag", "A"}});
+  expectReason("fetchStorebagWithName: The storebag's \"bag\" is no base64");
+  serveDocument(Dictionary{{"signature", "AAAA"}});
+  expectReason("fetchStorebagWithName: The storebag's \"bag\" is missing or no text");
+}
+
+TEST_F(StorebagFailures, NameSignedBytesThatAreNoBag) {
+  serve({200, {}, signedDocument("no property list", test_.propertyLists), std::nullopt});
+  expectReason("fetchStorebagWithName: What the storebag's signature covers is no property list: ");
+  serve(
+      {200, {}, signedDocument(test_.propertyLists.serialize(Array{1}), test_.propertyLists), std::nullopt});
+  expectReason("fetchStorebagWithName: What the storebag's signature covers is no dictionary");
+}
+
+TEST_F(StorebagFailures, NameAMissingVersion) {
+  serveBag(Dictionary{{"release", section_}});
+  expectReason(
+      "fetchStorebagForEnvironmentAndClientType: The storebag for client type 5 has no text \"version\"");
+}
+
+TEST_F(StorebagFetcherTest, TakesAKeyThatWasInstalledLater) {
+  serveBag(bag_);
+  test_.clientBundle.removeResource("publicKey", "der");
+  EXPECT_FALSE(fetch());
+  test_.clientBundle.setResource("publicKey", "der", testPublicKey());
+  EXPECT_EQ(fetch(), bag_);
+}
+
+TEST_F(StorebagFetcherTest, TakesABagThatEitherKeyVerifies) {
+  serveBag(bag_);
+  test_.clientBundle.setResource("publicKey", "der", otherPublicKey());
+  EXPECT_FALSE(fetch());
+  test_.clientBundle.setResource("publicKey2", "der", testPublicKey());
+  EXPECT_EQ(fetch(), bag_);
+  test_.clientBundle.setResource("publicKey", "der", testPublicKey());
+  test_.clientBundle.setResource("publicKey2", "der", otherPublicKey());
+  EXPECT_EQ(fetch(), bag_);
+  test_.clientBundle.setResource("publicKey2", "der", Data("no key"));
+  EXPECT_EQ(fetch(), bag_);
+  test_.clientBundle.setResource("publicKey2", "der", testPublicKey());
+  test_.clientBundle.removeResource("publicKey", "der");
+  EXPECT_EQ(fetch(), bag_);
+  test_.clientBundle.setResource("publicKey", "der", otherPublicKey());
+  test_.clientBundle.setResource("publicKey2", "der", otherPublicKey());
+  test_.sink.clear();
+  EXPECT_FALSE(fetch());
+  EXPECT_EQ(test_.sink.count(LogLevel::error, "Signature can not be verified"), 1U) << "once for both";
 }
 
 }  // namespace

@@ -144,6 +144,28 @@ TEST_F(StorebagServer, AMissingBagIsAFailure) {
   EXPECT_TRUE(daemon_.logged("fetchAndCacheStorebag: Unable to fetch storebag for client type 5"));
   ASSERT_TRUE(nginx_->waitForAccesses(1));
   EXPECT_EQ(nginx_->accesses()[0], "GET /storebags/tolvar/torvel 404 HTTP/2.0 since=\"-\"");
+  EXPECT_TRUE(daemon_.logged("/storebags/tolvar/torvel?version=8.0 answered with status 404"))
+      << daemon_.log();
+}
+
+// The bundle's key is a link, as the package makes it, to where the deployment puts it.
+TEST_F(StorebagServer, IsBelievedFromTheMomentThatItsKeyIsInstalled) {
+  const std::string bundle = "usr/share/kytreporting/KYTReporting.bundle/";
+  const std::string key = daemon_.root().read(bundle + "publicKey.der");
+  for (const std::string name : {"publicKey.der", "publicKey2.der"}) {
+    std::filesystem::remove(daemon_.root() / (bundle + name));
+    std::filesystem::create_symlink(daemon_.root() / ("etc/kytreportingd/" + name),
+                                    daemon_.root() / (bundle + name));
+  }
+  for (const char* name : {"torvel", "brisca", "emrit"}) nginx_->put(name, bag("httppost"), 10);
+  EXPECT_EQ(configured(kTorvel), "none");
+  EXPECT_TRUE(daemon_.logged("fetchStorebagWithName: The bundle has no publicKey.der that could be read"))
+      << daemon_.log();
+  daemon_.root().write("etc/kytreportingd/publicKey.der", otherPublicKey().view());
+  EXPECT_EQ(configured(kBrisca), "none");
+  EXPECT_TRUE(daemon_.logged("fetchStorebagWithName: Signature can not be verified, ")) << daemon_.log();
+  daemon_.root().write("etc/kytreportingd/publicKey2.der", key);
+  EXPECT_EQ(configured(kEmrit), "live: httppost") << context();
 }
 
 TEST_F(StorebagServer, MayDieInTheMiddleOfABag) {

@@ -1,9 +1,7 @@
 #include "platform/linux/system/TomlBundle.h"
 
-#include <dirent.h>
-
 #include <cerrno>
-#include <utility>
+#include <variant>
 
 #include "platform/TextEscape.h"
 #include "platform/linux/system/Toml.h"
@@ -12,17 +10,12 @@ namespace kyt {
 
 TomlBundle::TomlBundle(const std::string& folder, Log& log) : folder_(folder), log_(log) {
   MutexLock lock(mutex_);
-  readAgain();
+  readVersion();
 }
 
 bool TomlBundle::failed(const std::string& path, const ReadProblem& problem) {
   log_.error("bundle: %s: %s", escapedText(path).c_str(), problem.text.c_str());
   return isMomentary(problem.error);
-}
-
-void TomlBundle::readAgain() {
-  if (versionUnread_) readVersion();
-  if (resourcesUnread_) readResources();
 }
 
 void TomlBundle::readVersion() {
@@ -47,43 +40,23 @@ void TomlBundle::readVersion() {
   }
 }
 
-void TomlBundle::readResources() {
-  resourcesUnread_ = false;
-  DIR* entries = ::opendir(folder_.c_str());
-  if (entries == nullptr) {
-    resourcesUnread_ = failed(folder_, {errorText(errno), errno});
-    return;
-  }
-  const dirent* entry = nullptr;
-  while (errno = 0, (entry = ::readdir(entries)) != nullptr) {
-    const std::string name = entry->d_name;
-    if (name.starts_with('.') || name == "info.toml" || resources_.contains(name)) continue;
-    const std::string path = folder_ + "/" + name;
-    auto contents = readRegularFile(path, kMaxResourceBytes);
-    if (const auto* wrong = std::get_if<ReadProblem>(&contents)) {
-      resourcesUnread_ |= failed(path, *wrong);
-    } else {
-      resources_.emplace(name, Data(std::string_view(std::get<FileContents>(contents).bytes)));
-    }
-  }
-  if (errno != 0) resourcesUnread_ |= failed(folder_, {errorText(errno), errno});
-  ::closedir(entries);
-}
-
 std::optional<String> TomlBundle::version() {
   MutexLock lock(mutex_);
-  readAgain();
+  if (versionUnread_) readVersion();
   return version_;
 }
 
 std::optional<Data> TomlBundle::resource(std::string_view name, std::string_view type) {
   std::string file(name);
   if (!type.empty()) file.append(".").append(type);
-  MutexLock lock(mutex_);
-  if (!resources_.contains(file)) readAgain();
-  const auto found = resources_.find(file);
-  if (found == resources_.end()) return std::nullopt;
-  return found->second;
+  if (file.find('/') != file.npos) return std::nullopt;
+  const std::string path = folder_ + "/" + file;
+  const auto contents = readRegularFile(path, kMaxResourceBytes);
+  if (const auto* read = std::get_if<FileContents>(&contents)) return Data(std::string_view(read->bytes));
+  const auto& wrong = std::get<ReadProblem>(contents);
+  // What is not there is no fault of the bundle's; one that momentarily cannot be read is read at the next question.
+  if (wrong.error != ENOENT) static_cast<void>(failed(path, wrong));
+  return std::nullopt;
 }
 
 }  // namespace kyt

@@ -1,10 +1,10 @@
-// A bundle: a folder with info.toml (`version = "8.0"`) and resources named NAME.TYPE. All of it is read at
+// A bundle: a folder with info.toml (`version = "8.0"`) and resources named NAME.TYPE. The version is read at
 // construction and constant afterwards; only what the machine could not read then (no descriptor, no memory) is read
-// when it is asked for. A missing or bad info.toml means no version, a missing resource no resource: what that means is
+// when it is asked for. A resource is read each time that it is asked for: one that is put there later counts, and so
+// does its replacement. A missing or bad info.toml means no version, a missing resource no resource: what that means is
 // its user's to say. Any thread.
 #pragma once
 
-#include <map>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -22,22 +22,19 @@ class TomlBundle final : public Bundle {
 
   TomlBundle(const std::string& folder, Log& log);
   [[nodiscard]] std::optional<String> version() override EXCLUDES(mutex_);
-  [[nodiscard]] std::optional<Data> resource(std::string_view name, std::string_view type) override
-      EXCLUDES(mutex_);
+  // Logs what is there and cannot be read.
+  [[nodiscard]] std::optional<Data> resource(std::string_view name, std::string_view type) override;
 
  private:
-  void readAgain() REQUIRES(mutex_);
   void readVersion() REQUIRES(mutex_);
-  void readResources() REQUIRES(mutex_);
   // Logs it; whether to try again.
   [[nodiscard]] bool failed(const std::string& path, const ReadProblem& problem);
 
   const std::string folder_;
   Log& log_;
   Mutex mutex_;
-  bool versionUnread_ GUARDED_BY(mutex_) = true, resourcesUnread_ GUARDED_BY(mutex_) = true;
+  bool versionUnread_ GUARDED_BY(mutex_) = true;
   std::optional<String> version_ GUARDED_BY(mutex_);
-  std::map<std::string, Data, std::less<>> resources_ GUARDED_BY(mutex_);  // by file name
 };
 
 }  // namespace kyt

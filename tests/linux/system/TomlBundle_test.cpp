@@ -16,7 +16,7 @@ TEST(TomlBundle, HoldsItsVersionAndResources) {
   folder.write("info.toml", "version = \"8.0\"\n");
   folder.write("publicKey.der", std::string("\x30\x00\xff", 3));
   TomlBundle bundle(folder.path(), log);
-  std::filesystem::remove_all(folder.path());
+  std::filesystem::remove(folder / "info.toml");
   EXPECT_EQ(bundle.version(), String("8.0"));
   ASSERT_TRUE(bundle.resource("publicKey", "der"));
   EXPECT_EQ(bundle.resource("publicKey", "der")->view(), std::string_view("\x30\x00\xff", 3));
@@ -62,10 +62,30 @@ TEST(TomlBundle, ReadsWhatCouldNotBeOpenedAtTheStartWhenItIsAskedFor) {
     bundle.emplace(folder.path(), log);
     EXPECT_EQ(bundle->resource("publicKey", "der"), std::nullopt);
   }
-  EXPECT_TRUE(sink.contains(LogLevel::error, "bundle: " + folder.path() + ": Too many open files"));
+  EXPECT_TRUE(
+      sink.contains(LogLevel::error, "bundle: " + (folder / "publicKey.der") + ": Too many open files"));
   EXPECT_EQ(bundle->version(), String("8.0"));
   ASSERT_TRUE(bundle->resource("publicKey", "der"));
   EXPECT_EQ(bundle->resource("publicKey", "der")->view(), "key");
+}
+
+TEST(TomlBundle, ReadsAResourceEachTime) {
+  const TemporaryFolder folder;
+  MemoryLogSink sink;
+  Log log(sink);
+  folder.write("info.toml", "version = \"8.0\"\n");
+  TomlBundle bundle(folder.path(), log);
+  EXPECT_EQ(bundle.resource("publicKey", "der"), std::nullopt);
+  folder.write("publicKey.der", "installed later");
+  ASSERT_TRUE(bundle.resource("publicKey", "der"));
+  EXPECT_EQ(bundle.resource("publicKey", "der")->view(), "installed later");
+  folder.write("next", "another");
+  std::filesystem::rename(folder / "next", folder / "publicKey.der");
+  ASSERT_TRUE(bundle.resource("publicKey", "der"));
+  EXPECT_EQ(bundle.resource("publicKey", "der")->view(), "another");
+  std::filesystem::remove(folder / "publicKey.der");
+  EXPECT_EQ(bundle.resource("publicKey", "der"), std::nullopt);
+  EXPECT_TRUE(sink.lines().empty()) << "a missing one is its user's to tell of";
 }
 
 }  // namespace
