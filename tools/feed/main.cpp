@@ -4,98 +4,61 @@
 //   {"method":2,"respCode":3,"event":1,"time":1769860800.25,"message":{"key":"value"}}
 //
 // Only "method" and "respCode" are required; events are numbered from 1, and happen now. Exit status: 0 when
-// everything was handed over and the back end has ended, 1 for a line that is none, 2 when there is no back
+// everything was handed over and, where acknowledgements are asked for, acknowledged; 1 for a line that is no
+// event, for what cannot be read or written, and for events that nobody acknowledged; 2 when there is no back
 // end.
+#include <fcntl.h>
+
 #include <algorithm>
-#include <cmath>
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <fstream>
 #include <iostream>
 
-#include "backends/dashboard/DashboardBackend.h"
-#include "platform/Counters.h"
 #include "platform/Keys.h"
-#include "platform/Limits.h"
-#include "platform/Platform.h"
 #include "platform/Semaphore.h"
-#include "platform/System.h"
 #include "platform/TextEscape.h"
-#include "platform/WorkerPool.h"
-#include "platform/linux/LinuxMemoryInfo.h"
-#include "platform/linux/LinuxRandom.h"
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
-#include "platform/linux/ZlibDeflate.h"
-#include "platform/linux/base/EpollReactor.h"
-#include "platform/linux/base/LinuxClock.h"
-#include "platform/linux/base/LinuxUDPSocket.h"
 #include "platform/linux/cli/CommandLine.h"
-#include "platform/linux/system/DlopenPluginBundles.h"
-#include "platform/linux/system/JournalPowerLog.h"
-#include "platform/linux/system/LinuxDeviceProperties.h"
-#include "platform/linux/system/LinuxFileExtensions.h"
-#include "platform/linux/system/LogSinks.h"
-#include "platform/linux/system/TomlUserDefaults.h"
-#include "platform/linux/url/CurlUrlSession.h"
+#include "tools/feed/Event.h"
+#include "tools/feed/Machine.h"
 
 namespace kyt::tools {
 namespace {
 
-constexpr Duration kPoll = std::chrono::milliseconds(2);
-constexpr Duration kLongestEnd =
-    std::chrono::seconds(30);  // the back end's own last resort comes far earlier
+using std::chrono::milliseconds;
 
+constexpr Duration kPoll = milliseconds(2);
+// The back end's own end: its next tick, then its last resort. The rest is for a machine that is slow.
+constexpr Duration kLastResort = milliseconds(9500), kPatience = std::chrono::seconds(20);
+constexpr int kPeriodWithoutProfile = 500;
 constexpr size_t kLongestShown = 1024;  // of a line that is no event
 
 struct Options {
   std::string server, file = "-", selfVersion = "8.0", device = std::string(40, '0');
   uint16_t port = 0, clientVersion = 0;
-  int reliable = 0, clientType = 0, intervalMilliseconds = 0;
+  std::optional<int> reliable;  // milliseconds; the back end takes less than 10 as 10
+  int clientType = 0, intervalMilliseconds = 0;
   bool withoutProfile = false;
   uint32_t session = 0;
-};
 
-class NoBundle final : public Bundle {
- public:
-  std::optional<String> version() override { return std::nullopt; }
-  std::optional<Data> resource(std::string_view, std::string_view) override { return std::nullopt; }
-};
-
-// The real adapters of this machine. What a dashboard back end never asks for is there all the same, since
-// every back end is made with all ports; nothing is stored anywhere.
-struct Machine {
-  StderrSink sink;
-  Log log{sink};
-  Limits limits;
-  Counters counters;
-  LinuxClock clock;
-  std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
-  WorkerPool workers{WorkerPoolOptions{}};
-  LinuxRandom random;
-  LinuxMemoryInfo memory;
-  OpenSSLCryptography cryptography;
-  PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
-  ZlibDeflate deflate;
-  TomlUserDefaults userDefaults{{"/nonexistent"}, log, counters, clock};
-  LinuxDeviceProperties deviceProperties{DeviceSources{}, cryptography, log, clock};
-  DefaultsDiagnosticsConsent consent{userDefaults};
-  CurlURLSessionFactory urlSessions{CurlURLSessionOptions{}, log, counters};
-  LinuxUDPSocketFactory udpSockets;
-  NoBundle bundle;
-  LinuxFileExtensions fileExtensions{nullptr, log, counters};
-  DlopenPluginBundles pluginBundles{"/nonexistent", log};
-  JournalPowerLog powerLog{counters};
-  Platform platform{
-      limits,       counters,         log,     clock,        *reactor,       *reactor,      workers, random,
-      userDefaults, deviceProperties, consent, cryptography, propertyLists,  json,          deflate, memory,
-      urlSessions,  udpSockets,       bundle,  bundle,       fileExtensions, pluginBundles, powerLog};
-  ~Machine() {
-    workers.shutDown();
-    if (reactor) reactor->stop();
+  [[nodiscard]] bool isReliable() const { return withoutProfile || reliable; }
+  [[nodiscard]] Duration period() const {
+    return milliseconds(withoutProfile ? kPeriodWithoutProfile : reliable.value_or(kPeriodWithoutProfile));
   }
 };
+
+int complain(const std::string& text) {
+  std::fprintf(stderr, "kytfeed: %s\n", escapedText(text).c_str());
+  return 1;
+}
+
+// A socket that took the number of a closed standard stream would get what is printed.
+void keepStandardStreams() {
+  for (int number = 0; number <= 2; ++number)
+    if (::fcntl(number, F_GETFD) < 0)
+      static_cast<void>(::open("/dev/null", number == 0 ? O_WRONLY : O_RDONLY));
+}
 
 void pauseFor(Duration duration) {
   Semaphore never;
@@ -110,7 +73,7 @@ std::shared_ptr<DashboardBackend> makeBackend(Machine& machine, const Options& o
                                        std::optional<String>(options.server), options.port, std::nullopt);
   } else {
     Dictionary profile{{"ip", options.server}, {"port", int64_t{options.port}}};
-    if (options.reliable > 0) profile.set("reliable", options.reliable);
+    if (options.reliable) profile.set("reliable", *options.reliable);
     backend = DashboardBackend::initWithName(machine.platform, kKYTReportingBackendDashboard,
                                              std::optional<Dictionary>(profile), std::nullopt);
   }
@@ -123,39 +86,42 @@ std::shared_ptr<DashboardBackend> makeBackend(Machine& machine, const Options& o
   return backend;
 }
 
-TimeValue timeFrom(const Value* time, const Clock& clock) {
-  if (time == nullptr) return clock.timeOfDay();
-  // Rounded: 5.004 is a little less than that as a binary number, and is meant as 5.004.
-  constexpr int64_t kMicrosecondsInSecond = 1000000;
-  constexpr double kMostSeconds = 1e12;
-  const int64_t microseconds = std::llround(std::clamp(time->doubleValue(), -kMostSeconds, kMostSeconds) *
-                                            static_cast<double>(kMicrosecondsInSecond));
-  int64_t seconds = microseconds / kMicrosecondsInSecond;
-  if (microseconds % kMicrosecondsInSecond < 0) --seconds;
-  return {seconds, static_cast<int32_t>(microseconds - seconds * kMicrosecondsInSecond)};
-}
+class Feed {
+ public:
+  Feed(Machine& machine, DashboardBackend& backend) : machine_(machine), backend_(backend) {}
 
-// Null when the line is no event.
-Value sendLine(Machine& machine, DashboardBackend& backend, const std::string& text, uint16_t& number) {
-  const auto parsed = machine.json.parse(text);
-  const Value* value = std::get_if<Value>(&parsed);
-  const Dictionary* event = value != nullptr ? value->dictionary() : nullptr;
-  const Value* method = event != nullptr ? event->find("method") : nullptr;
-  const Value* respCode = event != nullptr ? event->find("respCode") : nullptr;
-  if (method == nullptr || respCode == nullptr) return {};
-  const Value* given = event->find("event");
-  number = static_cast<uint16_t>(given != nullptr ? given->intValue() : number + 1);
-  const Value* message = event->find("message");
-  const Dictionary* pairs = message != nullptr ? message->dictionary() : nullptr;
-  return backend.sendMessage(pairs != nullptr ? *pairs : Dictionary(),
-                             timeFrom(event->find("time"), machine.clock),
-                             static_cast<uint16_t>(method->intValue()),
-                             static_cast<uint16_t>(respCode->intValue()), EventID{number});
-}
+  // Whether the line is an event and its log line could be printed; a complaint says what is wrong otherwise.
+  bool send(const std::string& text) {
+    ++line_;
+    if (text.empty()) return true;
+    const auto read = eventFrom(text, machine_.json);
+    if (const auto* why = std::get_if<std::string>(&read)) {
+      complain("line " + std::to_string(line_) + " is no event: " + *why + ": " +
+               text.substr(0, kLongestShown));
+      return false;
+    }
+    const auto& event = std::get<FedEvent>(read);
+    number_ = event.number.value_or(static_cast<uint16_t>(number_ + 1));
+    const Value line = backend_.sendMessage(event.message, event.time.value_or(machine_.clock.timeOfDay()),
+                                            event.method, event.respCode, EventID{number_});
+    if (line.string() == nullptr) return false;  // the back end has said why
+    ++handedOver_;
+    if (std::puts(escapedText(line.string()->view()).c_str()) >= 0 && std::fflush(stdout) == 0) return true;
+    complain(std::string("can't write: ") + std::strerror(errno));
+    return false;
+  }
+  [[nodiscard]] uint64_t handedOver() const { return handedOver_; }
+
+ private:
+  Machine& machine_;
+  DashboardBackend& backend_;
+  uint64_t line_ = 0, handedOver_ = 0;
+  uint16_t number_ = 0;
+};
 
 // The clean-up waits for acknowledgements, and has a last resort of its own.
-bool waitForEnd(Machine& machine) {
-  const MonotonicTime end = machine.clock.monotonic() + kLongestEnd;
+bool waitForEnd(Machine& machine, const Options& options) {
+  const MonotonicTime end = machine.clock.monotonic() + options.period() + kLastResort + kPatience;
   while (machine.udpSockets.openSockets() != 0) {
     if (machine.clock.monotonic() > end) return false;
     pauseFor(kPoll);
@@ -163,40 +129,56 @@ bool waitForEnd(Machine& machine) {
   return true;
 }
 
-int feed(const Options& options, std::istream& in) {
+// 0, or 1 after a complaint.
+int reportLosses(const Machine& machine, const Options& options, uint64_t handedOver) {
+  const uint64_t lost = machine.counters.value(Reason::datagramDisplaced) +
+                        machine.counters.value(Reason::datagramUnacknowledged) +
+                        machine.counters.value(Reason::datagramGivenUp);
+  if (lost == 0) return 0;
+  return complain(std::to_string(lost) + " of " + std::to_string(handedOver) + " events " +
+                  (options.isReliable() ? "were never acknowledged" : "could not be sent"));
+}
+
+// `readError` says why reading ended before the end, or nothing.
+template <typename ReadError>
+int feed(const Options& options, std::istream& in, ReadError readError) {
   Machine machine;
   if (!machine.reactor) return 2;
   std::shared_ptr<DashboardBackend> backend = makeBackend(machine, options);
   if (!backend) return 2;
   int status = 0;
-  uint16_t number = 0;
-  for (std::string text; std::getline(in, text);) {
-    if (text.empty()) continue;
-    const Value line = sendLine(machine, *backend, text, number);
-    if (line.isNull()) {
-      std::fprintf(stderr, "kytfeed: no event: %s\n", escapedText(text.substr(0, kLongestShown)).c_str());
-      status = 1;
-      break;
-    }
-    std::puts(escapedText(line.string()->view()).c_str());
-    std::fflush(stdout);
-    if (options.intervalMilliseconds > 0) pauseFor(std::chrono::milliseconds(options.intervalMilliseconds));
+  Feed fed(machine, *backend);
+  errno = 0;
+  for (std::string text; status == 0 && std::getline(in, text);) {
+    if (!fed.send(text)) status = 1;
+    if (status == 0 && options.intervalMilliseconds > 0) pauseFor(milliseconds(options.intervalMilliseconds));
+    errno = 0;
+  }
+  if (status == 0 && readError()) {
+    const int why = errno;
+    status =
+        complain("can't read " + options.file + (why != 0 ? std::string(": ") + std::strerror(why) : ""));
   }
   backend->cleanup();
   backend.reset();
-  return waitForEnd(machine) ? status : 2;
+  if (!waitForEnd(machine, options)) return 2;
+  machine.end();
+  return std::max(status, reportLosses(machine, options, fed.handedOver()));
 }
 
 }  // namespace
 }  // namespace kyt::tools
 
 int main(int argc, char** argv) {
-  kyt::tools::Options options;
+  using namespace kyt::tools;
+  keepStandardStreams();
+  Options options;
   CLI::App app("Feeds events to a dashboard server and prints their local log lines", "kytfeed");
   kyt::addCommonOptions(app);
   app.add_option("--server", options.server, "The server's IPv4 address")->required();
   app.add_option("--port", options.port, "Its UDP port")->required();
-  app.add_option("--reliable", options.reliable, "Reliable delivery: milliseconds between its ticks");
+  app.add_option("--reliable", options.reliable,
+                 "Reliable delivery: milliseconds between its ticks; less than 10 counts as 10");
   app.add_flag("--without-profile", options.withoutProfile, "As a back end without one: reliable, 500 ms");
   app.add_option("--session", options.session, "The session ID, 32 bits");
   app.add_option("--client-type", options.clientType, "The client type, 0 to 23");
@@ -206,11 +188,8 @@ int main(int argc, char** argv) {
   app.add_option("--interval", options.intervalMilliseconds, "Milliseconds between events");
   app.add_option("events", options.file, "A file with one JSON object a line, or - for standard input");
   if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
-  if (options.file == "-") return kyt::tools::feed(options, std::cin);
+  if (options.file == "-") return feed(options, std::cin, [] { return std::ferror(stdin) != 0; });
   std::ifstream file(options.file);
-  if (!file) {
-    std::fprintf(stderr, "kytfeed: can't read %s\n", options.file.c_str());
-    return 1;
-  }
-  return kyt::tools::feed(options, file);
+  if (!file) return complain("can't read " + options.file + ": " + std::strerror(errno));
+  return feed(options, file, [&file] { return file.bad(); });
 }

@@ -126,7 +126,10 @@ int SessionScript::open(const Dictionary& step) {
   KYTReporting::Options options;
   options.socketPath = socketPath(connection_);
   options.sessionInfo = dictionaryAt(step, "sessionInfo").value_or(Dictionary());
-  if (const auto problem = problemInSessionInfo(options.sessionInfo)) return failed("open: " + *problem);
+  if (const auto problem = KYTReporting::checkSessionInfo(options.sessionInfo))
+    return failed("open: " + problem->localizedDescription);
+  if (!options.sessionInfo.contains(kKYTReportingSessionInfoClientType))
+    return failed("open: session information: \"ClientType\" is missing");
   options.userInfo = dictionaryAt(step, "userInfo");
   if (isTrue(step, "aggregate"))
     options.aggregationBlock = [aggregated = aggregated_](const AggregatedMessage& message) {

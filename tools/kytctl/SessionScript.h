@@ -8,8 +8,8 @@
 
 #include "kytreporting/KYTReporting.h"
 #include "platform/Value.h"
+#include "tools/KeyRules.h"
 #include "tools/kytctl/Answers.h"
-#include "tools/kytctl/KeyRules.h"
 
 namespace kyt::tools {
 

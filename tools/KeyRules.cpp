@@ -1,26 +1,9 @@
-#include "tools/kytctl/KeyRules.h"
+#include "tools/KeyRules.h"
 
 #include <algorithm>
-#include <array>
-
-#include "platform/Keys.h"
 
 namespace kyt::tools {
 namespace {
-
-constexpr int64_t kLast16 = 65535, kLast32 = 4294967295, kLastClientType = 23;
-
-constexpr std::array kSessionInfo = {
-    KeyRule{kKYTReportingSessionInfoSessionID, KeyKind::number, false, 0, kLast32},
-    KeyRule{kKYTReportingSessionInfoClientType, KeyKind::number, true, 0, kLastClientType},
-    KeyRule{kKYTReportingSessionInfoClientVersion, KeyKind::number, false, 0, kLast16},
-    KeyRule{kKYTReportingSessionInfoBatchEvent, KeyKind::boolean},
-    KeyRule{kKYTReportingSessionInfoRequireUserInfo, KeyKind::boolean},
-    KeyRule{kKYTReportingSessionInfoHierarchyToken, KeyKind::object}};
-
-constexpr std::array kHierarchyToken = {
-    KeyRule{kKYTReportingHierarchyTokenTokenID, KeyKind::text, true},
-    KeyRule{kKYTReportingHierarchyTokenLevel, KeyKind::number, false, 0, kLast32}};
 
 std::string quoted(std::string_view name) {
   return "\"" + std::string(name) + "\"";
@@ -48,6 +31,9 @@ std::optional<std::string> problemOf(const Value& value, const KeyRule& rule) {
     case KeyKind::number:
       if (isBetween(value, rule)) return std::nullopt;
       return "must be a whole number from " + std::to_string(rule.least) + " to " + std::to_string(rule.most);
+    case KeyKind::real:
+      if (value.isNumber() && value.kind() != Value::Kind::boolean) return std::nullopt;
+      return "must be a number";
     case KeyKind::text:
       if (value.isString()) return std::nullopt;
       return "must be text";
@@ -70,15 +56,6 @@ std::optional<std::string> problemIn(const Dictionary& object, std::span<const K
   }
   for (const KeyRule& rule : rules)
     if (rule.required && object.find(rule.name) == nullptr) return quoted(rule.name) + " is missing";
-  return std::nullopt;
-}
-
-std::optional<std::string> problemInSessionInfo(const Dictionary& sessionInfo) {
-  if (auto problem = problemIn(sessionInfo, kSessionInfo)) return "sessionInfo: " + *problem;
-  const Value* token = sessionInfo.find(kKYTReportingSessionInfoHierarchyToken);
-  if (token == nullptr) return std::nullopt;
-  if (auto problem = problemIn(*token->dictionary(), kHierarchyToken))
-    return "sessionInfo: HierarchyToken: " + *problem;
   return std::nullopt;
 }
 

@@ -1,0 +1,25 @@
+// One line of kytfeed's input.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <variant>
+
+#include "platform/Clock.h"
+#include "platform/DataServices.h"
+#include "platform/Value.h"
+
+namespace kyt::tools {
+
+struct FedEvent {
+  uint16_t method = 0, respCode = 0;
+  std::optional<uint16_t> number;
+  std::optional<TimeValue> time;
+  Dictionary message;
+};
+
+// The event, or why the line is none.
+[[nodiscard]] std::variant<FedEvent, std::string> eventFrom(const std::string& line, JSON& json);
+
+}  // namespace kyt::tools
