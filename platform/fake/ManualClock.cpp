@@ -4,7 +4,9 @@ namespace kyt {
 
 TimeValue ManualClock::timeOfDay() const {
   MutexLock lock(mutex_);
-  return timeOfDay_;
+  const TimeValue reading = timeOfDay_;
+  if (tick_ != Duration(0)) advanceLocked(tick_);
+  return reading;
 }
 
 MonotonicTime ManualClock::monotonic() const {
@@ -22,9 +24,18 @@ void ManualClock::setMonotonic(MonotonicTime value) {
   monotonic_ = value;
 }
 
-void ManualClock::advance(Duration duration) {
-  using namespace std::chrono;
+void ManualClock::setTick(Duration tick) {
   MutexLock lock(mutex_);
+  tick_ = tick;
+}
+
+void ManualClock::advance(Duration duration) {
+  MutexLock lock(mutex_);
+  advanceLocked(duration);
+}
+
+void ManualClock::advanceLocked(Duration duration) const {
+  using namespace std::chrono;
   monotonic_ += duration;
   const microseconds day = seconds(timeOfDay_.seconds) + microseconds(timeOfDay_.microseconds) +
                            duration_cast<microseconds>(duration);

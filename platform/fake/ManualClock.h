@@ -1,5 +1,5 @@
 // A clock that tests move by hand. Both readings begin at a fixed moment and stand still until told
-// otherwise. Any thread.
+// otherwise, or pass with each look at the time of day. Any thread.
 #pragma once
 
 #include "platform/Clock.h"
@@ -15,11 +15,17 @@ class ManualClock final : public Clock {
   void setTimeOfDay(TimeValue value);  // the monotonic reading stays
   void setMonotonic(MonotonicTime value);
   void advance(Duration duration);  // both readings
+  // From now on each reading of the time of day is followed by such an advance, so that who reads it twice
+  // shows. Zero: stands still again.
+  void setTick(Duration tick);
 
  private:
+  void advanceLocked(Duration duration) const REQUIRES(mutex_);
+
   mutable Mutex mutex_;
-  TimeValue timeOfDay_ GUARDED_BY(mutex_){1769860800, 0};  // 2026-01-31 12:00:00
-  MonotonicTime monotonic_ GUARDED_BY(mutex_){std::chrono::seconds(1000)};
+  mutable TimeValue timeOfDay_ GUARDED_BY(mutex_){1769860800, 0};  // 2026-01-31 12:00:00
+  mutable MonotonicTime monotonic_ GUARDED_BY(mutex_){std::chrono::seconds(1000)};
+  Duration tick_ GUARDED_BY(mutex_){0};
 };
 
 }  // namespace kyt

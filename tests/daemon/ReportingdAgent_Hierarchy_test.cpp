@@ -166,6 +166,28 @@ TEST_F(AgentHierarchy, AnUpdateBeneathAnAggregatorShutsDownTheSessionsOwnAggrega
   EXPECT_FALSE(c.session->hasAggregator()) << "b no longer aggregates, but a does";
 }
 
+// In the order in which they registered, not by level: the session of level 2, registered first, is brought in
+// step with a parent that is itself brought in step only after it.
+TEST_F(AgentHierarchy, AnUpdateVisitsSessionsInTheOrderOfTheirRegistration) {
+  Client c = clientWith(sessionInfoAt(2, "T", 7)), b = clientWith(sessionInfoAt(1, "T", 6));
+  configure(c);
+  const auto backendOfC = factory_.latest("httppost");
+  configure(b);
+  const auto backendOfB = factory_.latest("httppost");
+  factory_.prepare = [](RecordingBackend& made) { made.stateAfterUpdate = kBackendStateDisabled; };
+  Client a = clientWith(sessionInfoAt(0));
+  test_.sink.clear();
+  configure(a);
+  EXPECT_EQ(backendOfB->state(), kBackendStateDisabled);
+  EXPECT_EQ(backendOfC->state(), kBackendStateEnabled) << "its parent's state of that moment";
+  const std::string line =
+      "updateDownstreamSessions: Updating combined session ID and syncing reporting states for session ";
+  std::vector<std::string> visited;
+  for (const auto& logged : test_.sink.lines())
+    if (logged.line.starts_with(line)) visited.push_back(logged.line.substr(line.size()));
+  EXPECT_EQ(visited, (std::vector<std::string>{"7", "6"}));
+}
+
 TEST_F(AgentHierarchy, AnUpdateLeavesOthersOfTheSameLevelAlone) {
   const Client a = clientWith(sessionInfoAt(1, "T", 5), true),
                sibling = clientWith(sessionInfoAt(1, "T", 6), true);
@@ -225,6 +247,21 @@ TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
   EXPECT_TRUE(clientWith(sessionInfoAt(1, "B")).session->hierarchyToken())
       << "a token that exists may be joined";
   EXPECT_TRUE(clientWith(sessionInfoAt(0, "E"), false, 1001).session->hierarchyToken()) << "another user's";
+}
+
+TEST_F(AgentHierarchy, ATokenCountsOnceHoweverManySessionsJoinItAndHoweverOften) {
+  test_.limits.maxHierarchyTokensPerUser = 2;
+  Client a = clientWith(sessionInfoAt(0, "A")), child = clientWith(sessionInfoAt(1, "A"));
+  identify(child, sessionInfoAt(1, "A"));
+  const Client other = clientWith(sessionInfoAt(0, "B"));
+  EXPECT_TRUE(other.session->hierarchyToken()) << "the second token of the two";
+  EXPECT_FALSE(clientWith(sessionInfoAt(0, "C")).session->hierarchyToken());
+  identify(child, sessionInfoAt(1, "A"));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), a.session) << "at the limit a token is kept";
+  a.connection->invalidateNow();
+  const Client next = clientWith(sessionInfoAt(0, "A"));
+  EXPECT_EQ(agent_.parentSessionForChild(*child.session), next.session);
+  EXPECT_EQ(test_.counters.value(Reason::hierarchyTokenRefused), 1U);
 }
 
 TEST_F(AgentHierarchy, ALevelThatComesOrGoesChangesWhatIsAboveTheOthers) {

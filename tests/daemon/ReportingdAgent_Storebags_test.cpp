@@ -70,6 +70,66 @@ TEST_F(AgentStorebags, AFailureKeepsFromTheNextFetchForFifteenMinutes) {
   EXPECT_EQ(requests(), 2U);
 }
 
+// A download may take its 15 seconds; what it brought is fresh from its end.
+TEST_F(AgentStorebags, AgesFromTheEndOfTheFetch) {
+  FakeURLSessionFactory::Reply reply;
+  reply.headers = {{"Cache-Control", "max-age=600"}};
+  reply.body = signedBag(releaseBag(section_), test_.propertyLists);
+  test_.urlSessions.setResponder([this, reply](const URLRequest&) {
+    test_.clock.advance(std::chrono::seconds(15));
+    return reply;
+  });
+  const Client a = clientWith(sessionInfo(5));
+  EXPECT_EQ(storebag(a), section_);
+  test_.clock.advance(std::chrono::seconds(599));
+  EXPECT_EQ(storebag(a), section_);
+  EXPECT_EQ(requests(), 1U);
+  test_.clock.advance(std::chrono::seconds(1));
+  EXPECT_EQ(storebag(a), section_);
+  EXPECT_EQ(requests(), 2U);
+}
+
+TEST_F(AgentStorebags, WaitsFromTheEndOfAFetchThatFailed) {
+  FakeURLSessionFactory::Reply reply;
+  reply.error = Error{kKYTURLErrorDomain, 28, "too slow"};
+  test_.urlSessions.setResponder([this, reply](const URLRequest&) {
+    test_.clock.advance(std::chrono::seconds(15));
+    return reply;
+  });
+  const Client a = clientWith(sessionInfo(5));
+  EXPECT_FALSE(storebag(a));
+  test_.clock.advance(std::chrono::seconds(899));
+  EXPECT_FALSE(storebag(a));
+  EXPECT_EQ(requests(), 1U);
+  test_.clock.advance(std::chrono::seconds(1));
+  EXPECT_FALSE(storebag(a));
+  EXPECT_EQ(requests(), 2U);
+}
+
+TEST_F(AgentStorebags, AReplyWithoutLastModifiedLeavesTheStoredOne) {
+  serve(releaseBag(section_), {{"Last-Modified", "yesterday"}, {"Cache-Control", "max-age=60"}});
+  const Client a = clientWith(sessionInfo(5));
+  EXPECT_EQ(storebag(a), section_);
+  serve(releaseBag(section_, "2.0"), {{"Cache-Control", "max-age=60"}});
+  test_.clock.advance(std::chrono::seconds(60));
+  EXPECT_EQ(storebag(a), section_);
+  EXPECT_EQ(agent_.storebagVersionForSession(*a.session), String("2.0"));
+  test_.clock.advance(std::chrono::seconds(60));
+  EXPECT_EQ(storebag(a), section_);
+  ASSERT_EQ(requests(), 3U);
+  EXPECT_EQ(test_.urlSessions.requestHeader(2, "If-Modified-Since"), "yesterday");
+}
+
+TEST_F(AgentStorebags, AreThoseOfTheLatestIdentification) {
+  Client a = clientWith(sessionInfo(5));
+  EXPECT_TRUE(configure(a));
+  identify(a, sessionInfo(8));
+  EXPECT_TRUE(configure(a));
+  ASSERT_EQ(requests(), 2U);
+  EXPECT_NE(test_.urlSessions.request(0).url.find("/torvel?"), std::string::npos);
+  EXPECT_NE(test_.urlSessions.request(1).url.find("/dulvek?"), std::string::npos);
+}
+
 TEST_F(AgentStorebags, ABadSignatureIsAFailureLikeAnyOther) {
   test_.clientBundle.setResource("publicKey", "der", otherPublicKey());
   const Client a = clientWith(sessionInfo(5));

@@ -52,6 +52,42 @@ TEST_F(MessageRouting, HandsTheMessageToTheBackEnds) {
   }
 }
 
+TEST_F(MessageRouting, TakesTheTimeOnceForAllBackEndsAndTheAggregator) {
+  configure({"httppost", "qdx"});
+  client_.session->setHasAggregator(true);
+  const TimeValue now = test_.clock.timeOfDay();
+  test_.clock.setTick(std::chrono::seconds(1));
+  send(message(9, 200));
+  EXPECT_EQ(sentTo("httppost").at(0).timestamp, now);
+  EXPECT_EQ(sentTo("qdx").at(0).timestamp, now);
+  EXPECT_EQ(client_.connection->messagesToClient().at(0).timestamp, now.asSeconds());
+  send(message(9, 200));
+  EXPECT_EQ(sentTo("qdx").at(1).timestamp.asSeconds(), now.asSeconds() + 1)
+      << "the next has a time of its own";
+}
+
+TEST_F(MessageRouting, TakesTheTimeOnlyOfAMessageThatHasItsParameters) {
+  configure({"httppost"});
+  const TimeValue now = test_.clock.timeOfDay();
+  test_.clock.setTick(std::chrono::seconds(1));
+  send(Dictionary{{"Category", 1}});
+  send(message(9, 200));
+  EXPECT_EQ(sentTo("httppost").at(0).timestamp, now);
+}
+
+// The session reads the clock when it makes the message, and again when it sends it.
+TEST_F(MessageRouting, StampsAnInternalMessageAnew) {
+  TimeValue begin = test_.clock.timeOfDay();
+  test_.clock.setTick(std::chrono::seconds(1));
+  configure({"httppost"});
+  const auto posts = factory_.latest("httppost");
+  EXPECT_GT(posts->sent.at(0).timestamp.asSeconds(), begin.asSeconds()) << "the start message";
+  begin.seconds += 1000;
+  test_.clock.setTimeOfDay(begin);
+  client_.session->dealloc();
+  EXPECT_GT(posts->sent.at(1).timestamp.asSeconds(), begin.asSeconds()) << "the stop message";
+}
+
 TEST_F(MessageRouting, CutsCategoryAndTypeToTheirLowSixteenBits) {
   configure({"httppost"});
   backend("httppost").setLists(numbers({4}), std::nullopt);
@@ -173,6 +209,15 @@ class SingleMessage : public SessionFixture {
     return answer;
   }
 };
+
+TEST_F(SingleMessage, HasOneTimeForAllBackEnds) {
+  delegate_.storebag = table({"httppost", "qdx"});
+  const TimeValue now = test_.clock.timeOfDay();
+  test_.clock.setTick(std::chrono::seconds(1));
+  EXPECT_EQ(sendSingle(sessionInfo()), "finished");
+  EXPECT_EQ(backend("httppost").sent.at(0).timestamp, now);
+  EXPECT_EQ(backend("qdx").sent.at(0).timestamp, now);
+}
 
 TEST_F(SingleMessage, NeedsTheIdentifiers) {
   for (const char* key : {"SessionID", "ClientType"}) {

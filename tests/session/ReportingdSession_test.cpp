@@ -41,6 +41,44 @@ TEST_F(ReportingdSessionLife, ASecondIdentificationOverwritesTheFirst) {
   EXPECT_EQ(delegate_.calls, (std::vector<std::string>{"correlated 3", "correlated 0"}));
 }
 
+TEST_F(ReportingdSessionLife, IsConfiguredByItsLatestIdentification) {
+  client_.session->setSessionInfo(sessionInfo(42), userInfo("a"), nullptr, false);
+  Dictionary later = sessionInfo(43, false);
+  later.set(kKYTReportingSessionInfoClientType, 20);
+  configure(client_, {"httppost"}, later);
+  ASSERT_EQ(factory_.calls().size(), 1U);
+  EXPECT_EQ(factory_.calls()[0].sessionInfo, later);
+  EXPECT_EQ(factory_.calls()[0].userInfo, std::nullopt) << "the second said nothing of a user";
+  EXPECT_EQ(client_.session->sessionInfo(), later);
+}
+
+TEST_F(ReportingdSessionLife, TellsItsHierarchyBeforeItsStart) {
+  std::vector<std::vector<std::string>> calls;
+  delegate_.onDownstreamUpdate = [&] { calls.push_back(backend("httppost").calls); };
+  configure({"httppost"});
+  EXPECT_EQ(calls, (std::vector<std::vector<std::string>>{{"updateState"}}));
+  EXPECT_EQ(backend("httppost").calls, (std::vector<std::string>{"updateState", "send"}));
+}
+
+// The fake delegate insists on the lock in every test; here each of these calls comes.
+TEST_F(ReportingdSessionLife, HoldsTheAgentsLockForWhatConcernsOthersAndReleasesIt) {
+  configure(client_, {"httppost"}, sessionInfoAtLevel(1));
+  delegate_.lockedCalls.clear();
+  send(message(1, 1));
+  EXPECT_EQ(delegate_.lockedCalls, (std::vector<std::string>{"ancestor", "shared"}));
+  EXPECT_FALSE(delegate_.isLocked());
+  delegate_.lockedCalls.clear();
+  client_.session->updateSharedDataWithDictionary(Dictionary{{"k", 1}});
+  client_.session->updateSharedDataForKey("k", 2);
+  client_.session->updateSharedDataForKey("k", nullptr);
+  EXPECT_EQ(delegate_.lockedCalls, (std::vector<std::string>{"update", "update", "remove"}));
+  EXPECT_FALSE(delegate_.isLocked());
+  delegate_.lockedCalls.clear();
+  client_.session->dealloc();
+  EXPECT_EQ(delegate_.lockedCalls, (std::vector<std::string>{"health", "ancestor", "shared"}));
+  EXPECT_FALSE(delegate_.isLocked());
+}
+
 TEST_F(ReportingdSessionLife, TakesAHierarchyTokenThatIsNoDictionaryForNone) {
   Dictionary info = sessionInfo();
   info.set(kKYTReportingSessionInfoHierarchyToken, "T");

@@ -1,11 +1,14 @@
-// A session with recording back ends, a connection in memory, and a delegate that answers as the test says.
+// A session with recording back ends, a connection in memory, and a delegate that answers as the test says and
+// insists on the agent's lock where a session must hold it.
 #pragma once
 
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -28,6 +31,17 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   std::vector<std::string> calls;
   std::vector<Dictionary> updates;
   std::vector<std::string> removedKeys;
+  std::function<void()> onDownstreamUpdate;
+
+  // Whether somebody holds the lock, and so keeps another thread from it.
+  [[nodiscard]] bool isLocked() {
+    bool free = false;
+    std::thread([&] {
+      free = monitor_.tryLock();
+      if (free) monitor_.unlock();
+    }).join();
+    return !free;
+  }
 
   std::string description() const override { return "<Delegate>"; }
   Monitor& monitor() override { return monitor_; }
@@ -41,20 +55,33 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
     calls.push_back("correlated " + std::to_string(session.hierarchyLevel()));
   }
   std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(ReportingdSession&) override {
+    lockedCall("ancestor");
     return ancestor;
   }
-  void updateDownstreamSessions(ReportingdSession&) override { calls.emplace_back("downstream"); }
+  void updateDownstreamSessions(ReportingdSession&) override {
+    calls.emplace_back("downstream");
+    if (onDownstreamUpdate) onDownstreamUpdate();
+  }
   std::shared_ptr<ReportingdSession> parentSessionForChild(ReportingdSession&) override { return parent; }
   void updateSharedDataForSession(ReportingdSession&, const Dictionary& data) override {
+    lockedCall("update");
     updates.push_back(data);
   }
   void removeObjectFromSharedDataForSession(ReportingdSession&, const String& key) override {
+    lockedCall("remove");
     removedKeys.push_back(key.str());
   }
-  std::optional<Dictionary> sharedDataForSession(ReportingdSession&) override { return sharedData; }
+  std::optional<Dictionary> sharedDataForSession(ReportingdSession&) override {
+    lockedCall("shared");
+    return sharedData;
+  }
   void addAgentHealthInfoForSession(ReportingdSession&, Dictionary& payload) override {
+    lockedCall("health");
     payload.set("Health", 1);
   }
+
+  // The calls that must be made under the lock, as they came.
+  std::vector<std::string> lockedCalls;
 
   [[nodiscard]] int count(std::string_view call) const {
     int number = 0;
@@ -63,6 +90,11 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   }
 
  private:
+  void lockedCall(const char* call) {
+    EXPECT_TRUE(isLocked()) << call << " without the agent's lock";
+    lockedCalls.emplace_back(call);
+  }
+
   Monitor monitor_;
 };
 
