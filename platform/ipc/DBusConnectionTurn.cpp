@@ -116,7 +116,8 @@ DBusConnection::Step DBusConnection::readMore(std::span<std::byte> buffer, size_
   std::vector<Descriptor> received;
   const StreamResult result = stream_->read(buffer, received);
   const bool stopsEarly = !received.empty();
-  if (descriptorsAgreed_) {
+  // During the handshake they may belong to a message behind it, of which this read has the beginning.
+  if (descriptorsAgreed_ || handshake_) {
     for (Descriptor& descriptor : received) descriptors_.push_back(std::move(descriptor));
   }
   switch (result.status) {
@@ -178,6 +179,7 @@ DBusConnection::Step DBusConnection::handleHandshake(std::span<const std::byte> 
       return breakOff(Reason::handshakeFailed, handshake_->problem());
     case ServerHandshake::Status::done:
       descriptorsAgreed_ = handshake_->descriptorsAgreed();
+      if (!descriptorsAgreed_) descriptors_.clear();
       handshake_.reset();
       handshakeTimer_.cancel();
       output_->open();

@@ -72,6 +72,24 @@ TEST(DBusServer, TakesAnExtensionOfExactlyTwoDescriptors) {
   EXPECT_TRUE(eventually([&] { return test::openDescriptors() == before; }));
 }
 
+// As libraries do that send on without waiting for an answer.
+TEST(DBusServer, TakesDescriptorsThatCameWithTheHandshakesLastBytes) {
+  Server server;
+  PlainClient client(server.path);
+  char name[] = "/tmp/kyt-ipc-file-XXXXXX";
+  const Descriptor file = ownDescriptor(::mkstemp(name));
+  ASSERT_EQ(::unlink(name), 0);
+  ASSERT_EQ(::write(file.get(), "contents", 8), 8);
+  std::string bytes = ClientHandshake::opening(::getuid());
+  std::string call = test::everyCall()[7];
+  client.send(bytes + call, {file.get(), file.get()});
+  while (client.received().find("AGREE_UNIX_FD\r\n") == std::string::npos) ASSERT_TRUE(client.fill());
+  client.received().erase(0, client.received().find("AGREE_UNIX_FD\r\n") + 15);
+  EXPECT_EQ(client.receiveText(), "b");
+  EXPECT_TRUE(server.session()->has("upload file:///tmp/x token contents"))
+      << server.session()->notes().front();
+}
+
 TEST(DBusServer, EndsAConnectionThatPassesTooManyDescriptors) {
   Server server;
   const size_t before = test::openDescriptors();
