@@ -122,11 +122,11 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
   ServiceManager::ready("Listening");
   static_cast<void>(giveBackCodePages());
   const int signal = stopSignals.wait();
-  ServiceManager::stopping();
   if (signal != 0)
     log.normal("main: Ending on signal %d", signal);
   else
     log.normal("main: Ending, idle for %g seconds", settings.limits.idleExitSeconds);
+  ServiceManager::stopping();
   if (!services.shutDown()) std::_Exit(0);  // threads that do not end use all that would be destroyed here
   return 0;
 }

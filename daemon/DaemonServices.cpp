@@ -118,7 +118,7 @@ DaemonServices::DaemonServices(Start start)
       sessionClass_(configuration_, backendFactory_, messageLog_),
       queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),
       transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *reactor_, queue_,
-                   [this] { return isIdle(); }),
+                   [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),
       listener_(DBusServerServices{settings_.limits, counters_, log_, clock_, *reactor_, workers_, *reactor_,
                                    entitlements_, wireMachineId(deviceIdentity_, cryptography_)},
@@ -142,11 +142,21 @@ bool DaemonServices::isOutstanding() const {
 
 // The idle time counts anew from the end of what a session left behind. A connection may be on its way to becoming a
 // session, and before the start is over nothing here may be looked at.
-bool DaemonServices::isIdle() {
-  if (!resumed_ || listener_.connectionCount() != 0 || agent_.sessionCount() != 0 || isOutstanding())
-    return false;
-  idle_();
-  return true;
+bool DaemonServices::isIdle() const {
+  return resumed_ && listener_.connectionCount() == 0 && agent_.sessionCount() == 0 && !isOutstanding();
+}
+
+// The end of accepting comes before the decision is final: who connects from then on waits in the socket's line for the
+// next daemon, and is not taken by one that tells its service manager goodbye.
+bool DaemonServices::endWhenIdle() {
+  if (!isIdle()) return false;
+  listener_.pauseAccepting();
+  if (isIdle()) {
+    idle_();
+    return true;
+  }
+  listener_.resumeAccepting();
+  return false;
 }
 
 bool DaemonServices::shutDown() {

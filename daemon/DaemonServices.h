@@ -79,7 +79,8 @@ class DaemonServices {
 
  private:
   class Deadline;
-  [[nodiscard]] bool isIdle();
+  [[nodiscard]] bool endWhenIdle();
+  [[nodiscard]] bool isIdle() const;
   [[nodiscard]] bool isOutstanding() const;
   void endSessions(const Deadline& deadline);
   void waitForRequests(const Deadline& deadline);

@@ -12,6 +12,10 @@ const char* reasonName(Reason reason) {
       return "invalid-arguments";
     case Reason::unentitledConnection:
       return "unentitled-connection";
+    case Reason::connectionAtTheEnd:
+      return "connection-at-the-end";
+    case Reason::acceptFailed:
+      return "accept-failed";
     case Reason::handshakeFailed:
       return "handshake-failed";
     case Reason::handshakeTimedOut:

@@ -17,6 +17,8 @@ enum class Reason : uint8_t {
   malformedMessage,  // a connection ended for breaking the protocol
   invalidArguments,  // a call answered InvalidArgs
   unentitledConnection,
+  connectionAtTheEnd,  // refused since the daemon ends
+  acceptFailed,        // times that the system refused to watch the listening socket, or to accept
   handshakeFailed,
   handshakeTimedOut,
   messageTooLong,

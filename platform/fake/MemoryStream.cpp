@@ -35,13 +35,15 @@ AcceptStatus MemoryAcceptor::accept(std::unique_ptr<Stream>& stream) {
 
 class ManualReactor::Registration final : public Watch::State {
  public:
-  Registration(unsigned events, Handler handler) : events_(events), handler_(std::move(handler)) {}
+  Registration(unsigned events, Handler handler, std::shared_ptr<const bool> refuses)
+      : events_(events), handler_(std::move(handler)), refuses_(std::move(refuses)) {}
   bool modify(unsigned events) override {
     events_ = events;
     silent_ = false;
     return !cancelled_;
   }
   bool rearm() override {
+    if (*refuses_) return false;
     silent_ = false;
     return !cancelled_;
   }
@@ -60,12 +62,13 @@ class ManualReactor::Registration final : public Watch::State {
  private:
   unsigned events_;
   Handler handler_;
+  const std::shared_ptr<const bool> refuses_;
   bool silent_ = false, cancelled_ = false;
 };
 
 Watch ManualReactor::watch(int descriptor, unsigned events, Handler handler) {
   if (refuses) return {};
-  auto registration = std::make_shared<Registration>(events, std::move(handler));
+  auto registration = std::make_shared<Registration>(events, std::move(handler), refusesToRearm_);
   watches_[descriptor] = registration;
   if (whenWatched) whenWatched(descriptor);
   return Watch(std::move(registration));

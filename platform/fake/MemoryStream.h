@@ -59,12 +59,14 @@ class ManualReactor final : public Reactor {
   bool report(int descriptor, unsigned events);
   // What the watch of a descriptor waits for; 0: nothing, or nobody watches it.
   [[nodiscard]] unsigned waitsFor(int descriptor) const;
-  bool refuses = false;                             // to watch anything, as a system without memory does
+  bool refuses = false;  // to watch anything, as a system without memory does
+  void refuseToRearm(bool refuse) { *refusesToRearm_ = refuse; }
   std::function<void(int descriptor)> whenWatched;  // called before watch() returns
 
  private:
   class Registration;
   std::unordered_map<int, std::weak_ptr<Registration>> watches_;
+  std::shared_ptr<bool> refusesToRearm_ = std::make_shared<bool>(false);
 };
 
 }  // namespace kyt

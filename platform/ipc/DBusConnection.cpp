@@ -30,13 +30,19 @@ void DBusConnection::offer(Listener& listener, ListenerDelegate& delegate) {
     if (self->ended_ || self->closed()) return;
     const bool accepted = delegate.listenerShouldAcceptNewConnection(listener, self);
     self->peer_.reset();
-    if (!accepted) self->context_->services.counters.add(Reason::unentitledConnection);
+    if (!accepted) self->countRefusal();
     if (accepted && self->resumed_ && self->exportedObject_) {
       self->start();
     } else {
       self->end(false, false);
     }
   });
+}
+
+// Who lacks what was asked for is told nothing; who comes to a daemon that ends may come again.
+void DBusConnection::countRefusal() {
+  context_->services.counters.add(refused_ ? Reason::unentitledConnection : Reason::connectionAtTheEnd);
+  if (!refused_) output_->sendHandshake(kServerEnds);
 }
 
 void DBusConnection::start() {
@@ -112,6 +118,7 @@ void DBusConnection::end(bool broken, bool waitForOutput) {
   if (closed() || std::exchange(ended_, true)) return;
   invalidating_ = true;
   handshakeTimer_.cancel();
+  if (handshake_ && finishing_) output_->sendHandshake(kServerEnds);
   if (started_) {
     Task interruption = std::move(interruptionHandler_), invalidation = std::move(invalidationHandler_);
     if (broken && interruption) interruption();

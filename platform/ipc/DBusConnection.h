@@ -85,6 +85,7 @@ class DBusConnection final : public Connection,
   void keepRest(std::span<const std::byte> rest);
   Step breakOff(Reason reason, const char* problem);
 
+  void countRefusal();
   void start();
   void end(bool broken, bool waitForOutput);
   void closeStream();

@@ -14,6 +14,7 @@ namespace {
 
 constexpr unsigned kAcceptsPerTurn = 64;
 constexpr Duration kExhaustedPause = std::chrono::milliseconds(100);
+constexpr Duration kFailedPause = std::chrono::seconds(1);  // after what should not happen
 
 }  // namespace
 
@@ -31,12 +32,9 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     delegate_ = &delegate;
     MutexLock lock(mutex_);
     if (stopped_) return;
-    watch_ = context_->services.reactor.watch(acceptor_->descriptor(), ready::readable | ready::oneShot,
-                                              [weak = weak_from_this()](unsigned) {
-                                                const auto self = weak.lock();
-                                                if (self) self->queue_->async([self] { self->acceptSome(); });
-                                              });
-    if (!watch_) context_->services.log.error("DBusServer(resume): the system refuses to watch the socket");
+    accepting_ = true;
+    watchLocked();
+    if (!watch_) waitBeforeNextLocked("the system refuses to watch the socket");
   }
 
   // Nothing is accepted any more when this returns, except by a turn that has begun.
@@ -45,8 +43,23 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     {
       MutexLock lock(mutex_);
       stopped_ = true;
+      accepting_ = false;
       watch = std::move(watch_);
     }
+  }
+
+  // What the watch reports meanwhile is not lost: it is looked for at the resumption.
+  void pause() {
+    MutexLock lock(mutex_);
+    accepting_ = false;
+  }
+  void resume() {
+    {
+      MutexLock lock(mutex_);
+      if (stopped_) return;
+      accepting_ = true;
+    }
+    queue_->async([self = shared_from_this()] { self->acceptSome(); });
   }
 
   // The queue's work is done and none comes: what it refers to may go. Not from the queue.
@@ -55,13 +68,13 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
   }
 
  private:
-  bool stopped() {
+  bool accepting() {
     MutexLock lock(mutex_);
-    return stopped_;
+    return accepting_;
   }
 
   void acceptSome() {
-    for (unsigned i = 0; i < kAcceptsPerTurn && !stopped(); ++i) {
+    for (unsigned i = 0; i < kAcceptsPerTurn && accepting(); ++i) {
       std::unique_ptr<Stream> stream;
       switch (acceptor_->accept(stream)) {
         case AcceptStatus::accepted:
@@ -74,18 +87,28 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
         case AcceptStatus::exhausted:
           return waitForDescriptors();
         case AcceptStatus::failed:
-          context_->services.log.error("DBusServer(accept): the listening socket failed");
-          return;
+          return waitBeforeNext("the listening socket failed");
       }
     }
     rearm();
   }
 
+  void watchLocked() REQUIRES(mutex_) {
+    watch_ = context_->services.reactor.watch(acceptor_->descriptor(), ready::readable | ready::oneShot,
+                                              [weak = weak_from_this()](unsigned) {
+                                                const auto self = weak.lock();
+                                                if (self) self->queue_->async([self] { self->acceptSome(); });
+                                              });
+  }
+
+  // A refusal (no memory, no room for another watch) must not make a deaf daemon: the next try has a new watch.
   void rearm() {
     MutexLock lock(mutex_);
-    if (watch_ && !watch_.rearm()) {
-      context_->services.log.error("DBusServer(accept): the system refuses to watch the socket");
-    }
+    if (!accepting_) return;
+    if (watch_ && watch_.rearm()) return;
+    watch_ = Watch();
+    watchLocked();
+    if (!watch_) waitBeforeNextLocked("the system refuses to watch the socket");
   }
 
   // The waiting connection stays in the socket's backlog, so asking again at once would spin.
@@ -94,7 +117,23 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
                                                  context_->services.clock.monotonic())) {
       context_->services.log.error("DBusServer(accept): no descriptors left for new connections");
     }
-    pause_ = context_->services.timers.after(kExhaustedPause, queue_, [weak = weak_from_this()] {
+    MutexLock lock(mutex_);
+    pauseLocked(kExhaustedPause);
+  }
+
+  void waitBeforeNext(const char* problem) {
+    MutexLock lock(mutex_);
+    waitBeforeNextLocked(problem);
+  }
+  void waitBeforeNextLocked(const char* problem) REQUIRES(mutex_) {
+    if (context_->services.counters.addAndMayLog(Reason::acceptFailed,
+                                                 context_->services.clock.monotonic())) {
+      context_->services.log.error("DBusServer(accept): %s, trying again", problem);
+    }
+    pauseLocked(kFailedPause);
+  }
+  void pauseLocked(Duration time) REQUIRES(mutex_) {
+    pause_ = context_->services.timers.after(time, queue_, [weak = weak_from_this()] {
       if (const auto self = weak.lock()) self->acceptSome();
     });
   }
@@ -133,11 +172,12 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
   Listener& listener_;
   const std::shared_ptr<SerialQueue> queue_;
   ListenerDelegate* delegate_ = nullptr;
-  uint64_t lastNumber_ = 0;  // of the queue, as the pause
-  TimerHandle pause_;
+  uint64_t lastNumber_ = 0;  // of the queue
   Mutex mutex_;
   Watch watch_ GUARDED_BY(mutex_);
-  bool stopped_ GUARDED_BY(mutex_) = false;
+  TimerHandle pause_ GUARDED_BY(mutex_);
+  bool accepting_ GUARDED_BY(mutex_) = false;
+  bool stopped_ GUARDED_BY(mutex_) = false;  // for good
 };
 
 DBusServer::DBusServer(DBusServerServices services, std::unique_ptr<StreamAcceptor> acceptor)
@@ -156,6 +196,15 @@ void DBusServer::resume() {
 void DBusServer::stopAccepting() {
   acceptance_->stop();
   acceptance_->wait();
+}
+
+void DBusServer::pauseAccepting() {
+  acceptance_->pause();
+  acceptance_->wait();
+}
+
+void DBusServer::resumeAccepting() {
+  acceptance_->resume();
 }
 
 void DBusServer::invalidateConnections() {

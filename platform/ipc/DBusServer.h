@@ -1,7 +1,7 @@
 // The daemon's side of the IPC service: the real Listener. Accepts on its own serial queue whenever the
 // reactor says so, refuses what passes the limits of connections, and offers the rest to the delegate, each
-// on its own queue. When the system has no descriptors left it waits a little before it accepts again;
-// connections that exist go on.
+// on its own queue. When the system has no descriptors left, or refuses anything else, it waits a little before it
+// tries again; connections that exist go on.
 //
 // Owned by the composition root. The delegate and all services outlive it; it outlives nothing: its
 // connections share what they need, and are abandoned at its destruction when they have not ended before.
@@ -26,6 +26,10 @@ class DBusServer final : public Listener {
   void setDelegate(ListenerDelegate& delegate) override { delegate_ = &delegate; }
   void resume() override;
   void stopAccepting() override;
+  // For a while, or until stopAccepting(): who connects meanwhile waits in the socket's line. Nothing is accepted any
+  // more when it returns, and what was accepted is counted. Not from the listener's or a connection's queue.
+  void pauseAccepting();
+  void resumeAccepting();
   // How many connections exist, those that are ending included. Any thread.
   [[nodiscard]] size_t connectionCount() const { return context_->connectionCount(); }
   // The deadline of a shut-down: invalidates every connection that is left.

@@ -181,8 +181,10 @@ ClientHandshake::Status ClientHandshake::feed(std::span<const std::byte> bytes, 
       state_ = State::done;
     } else {
       state_ = State::failed;
-      problem_ =
-          command == "REJECTED" ? "the server rejected the user" : "the server's handshake is not understood";
+      serverEnds_ = line + "\r\n" == kServerEnds;
+      problem_ = serverEnds_             ? "the daemon is ending"
+                 : command == "REJECTED" ? "the server rejected the user"
+                                         : "the server's handshake is not understood";
     }
   }
   if (state_ == State::failed) return Status::failed;

@@ -18,6 +18,9 @@
 
 namespace kyt {
 
+// What a server that ends says instead of an answer. Clients may connect again: the next daemon takes them.
+inline constexpr std::string_view kServerEnds = "ERROR \"The daemon is ending\"\r\n";
+
 class ServerHandshake {
  public:
   enum class Status : uint8_t { goingOn, done, failed };
@@ -58,6 +61,7 @@ class ClientHandshake {
   Status feed(std::span<const std::byte> bytes, size_t& consumed);
   [[nodiscard]] bool descriptorsAgreed() const { return descriptorsAgreed_; }
   [[nodiscard]] const char* problem() const { return problem_; }
+  [[nodiscard]] bool serverEnds() const { return serverEnds_; }  // after failed
 
  private:
   enum class State : uint8_t { ok, descriptors, done, failed };
@@ -65,6 +69,7 @@ class ClientHandshake {
   size_t received_ = 0;
   State state_ = State::ok;
   bool descriptorsAgreed_ = false;
+  bool serverEnds_ = false;
   const char* problem_ = nullptr;
 };
 

@@ -120,6 +120,50 @@ TEST_F(Service, IsStartedByAClientAndEndsWhenIdleAndIsStartedByTheNextOne) {
   }
 }
 
+// The service manager is slow to read: two seconds pass between the decision to end and the end.
+TEST_F(Service, LeavesWhoComesAfterItsDecisionToEndToTheNextOne) {
+  daemon_.activateBySocket();
+  watch("", "");
+  daemon_.start();
+  ASSERT_TRUE(eventually([&] { return manager_.count("READY=1") == 1; })) << daemon_.log();
+  manager_.fill();
+  ASSERT_TRUE(eventually([&] { return daemon_.logged("main: Ending, idle for 0.2 seconds"); }));
+  TestClient client(daemon_.socketPath(), 5);
+  ASSERT_TRUE(daemon_.isWantedBySomeone());
+  EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  EXPECT_FALSE(daemon_.logged("listener: Accepting new VRP connection")) << daemon_.log();
+  static_cast<void>(manager_.told());
+  daemon_.start();
+  EXPECT_EQ(client.configure(), "none") << daemon_.log();
+  EXPECT_EQ(client->statistics().connections, 1U) << "no connection of it was cut";
+  client.close();
+  EXPECT_EQ(statusAfterReading(manager_), 0) << daemon_.log();
+}
+
+TEST_F(Service, CutsNobodyWhoComesAtTheMomentOfItsEnd) {
+  daemon_.writeSettings(
+      "[storebag]\ninternal_host = \"http://127.0.0.1:9\"\npublic_host = \"http://127.0.0.1:9\"\n"
+      "[log]\ntarget = \"stderr\"\n[service]\nidle_exit_seconds = 0.02\n");
+  daemon_.activateBySocket();
+  for (int round = 0; round < 30; ++round) {
+    daemon_.start({"--log-level", "default"});
+    // Each round comes a little later than the one before, around the moment of the end.
+    const auto comes = std::chrono::steady_clock::now() + std::chrono::milliseconds(20 + 2 * round);
+    ASSERT_TRUE(eventually([&] { return std::chrono::steady_clock::now() >= comes; }));
+    TestClient client(daemon_.socketPath(), 5);
+    auto answer = std::async(std::launch::async, [&] { return client.configure(); });
+    while (answer.wait_for(20ms) != std::future_status::ready)
+      if (daemon_.hasEnded()) {
+        EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+        daemon_.start({"--log-level", "default"});
+      }
+    EXPECT_EQ(answer.get(), "none") << daemon_.log();
+    EXPECT_EQ(client->statistics().connections, 1U) << round;
+    client.close();
+    EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  }
+}
+
 TEST_F(Service, IsStartedBySystemdsOwnSocketActivation) {
   if (::access("/usr/bin/systemd-socket-activate", X_OK) != 0)
     GTEST_SKIP() << "needs systemd-socket-activate";

@@ -353,6 +353,70 @@ TEST_F(DBusConnectionTest, TriesAgainToAcceptAfterAPauseWhenNoDescriptorsAreLeft
   EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
 }
 
+TEST_F(DBusConnectionTest, TriesAgainToAcceptAfterAnyOtherFailure) {
+  acceptor_->whenEmpty = AcceptStatus::failed;
+  ASSERT_TRUE(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+  for (int i = 0; i < 3; ++i) {
+    executor_.runAll();
+    EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), 0u) << "it must not spin";
+    timers_.advance(std::chrono::seconds(1));
+  }
+  EXPECT_EQ(counters_.value(Reason::acceptFailed), 3u);
+  EXPECT_EQ(sink_.count(LogLevel::error, "DBusServer(accept): the listening socket failed, trying again"),
+            1u);
+  acceptor_->whenEmpty = AcceptStatus::wouldBlock;
+  executor_.runAll();
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, WatchesItsSocketAnewWhenTheSystemRefused) {
+  reactor_.refuses = true;
+  reactor_.refuseToRearm(true);
+  ASSERT_TRUE(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+  executor_.runAll();
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), 0u);
+  EXPECT_EQ(counters_.value(Reason::acceptFailed), 1u);
+  timers_.advance(std::chrono::seconds(1));
+  executor_.runAll();
+  EXPECT_EQ(counters_.value(Reason::acceptFailed), 2u);
+  reactor_.refuses = false;
+  timers_.advance(std::chrono::seconds(1));
+  executor_.runAll();
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
+}
+
+TEST_F(DBusConnectionTest, LeavesWhoComesWhileAcceptingPausesInTheLine) {
+  server_->pauseAccepting();
+  const auto pipe = std::make_shared<MemoryPipe>();
+  acceptor_->waiting.push_back(std::make_unique<MemoryStream>(pipe, kStream + 1));
+  static_cast<void>(reactor_.report(MemoryAcceptor::kDescriptor, ready::readable));
+  executor_.runAll();
+  EXPECT_EQ(server_->connectionCount(), 1u);
+  EXPECT_EQ(acceptor_->waiting.size(), 1u);
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), 0u) << "what waits there must not wake anybody";
+  server_->resumeAccepting();
+  executor_.runAll();
+  EXPECT_EQ(server_->connectionCount(), 2u);
+  EXPECT_EQ(reactor_.waitsFor(MemoryAcceptor::kDescriptor), ready::readable);
+  server_->stopAccepting();
+  server_->resumeAccepting();
+  acceptor_->waiting.push_back(std::make_unique<MemoryStream>(pipe, kStream + 2));
+  executor_.runAll();
+  EXPECT_EQ(acceptor_->waiting.size(), 1u) << "the end of accepting is for good";
+}
+
+TEST_F(DBusConnectionTest, TellsAClientWhoseHandshakeTheEndCutsOffThatItMayComeAgain) {
+  connection_->finish();
+  executor_.runAll();
+  EXPECT_EQ(pipe_->fromServer, kServerEnds);
+  ClientHandshake handshake;
+  size_t consumed = 0;
+  EXPECT_EQ(handshake.feed(std::as_bytes(std::span(pipe_->fromServer)), consumed),
+            ClientHandshake::Status::failed);
+  EXPECT_TRUE(handshake.serverEnds());
+  EXPECT_STREQ(handshake.problem(), "the daemon is ending");
+}
+
 TEST_F(DBusConnectionTest, DescriptorsBehindBeginInOneReadBelongToTheirMessage) {
   std::string bytes = ClientHandshake::opening(1000);
   MessageWriter writer(bytes);

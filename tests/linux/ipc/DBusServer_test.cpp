@@ -177,6 +177,19 @@ TEST(DBusServer, RefusesAClientWithoutTheEntitlementBeforeTellingItAnything) {
   EXPECT_EQ(server.counted(Reason::unentitledConnection), 1u);
 }
 
+TEST(DBusServer, DoesNotTakeWhoComesAtTheEndForUnentitled) {
+  Server server;
+  server.ending = true;
+  PlainClient client(server.path);
+  client.send(ClientHandshake::opening(::getuid()));
+  while (client.fill()) {
+  }
+  EXPECT_EQ(client.received(), kServerEnds);
+  EXPECT_TRUE(eventually([&] { return server.listener->connectionCount() == 0; }));
+  EXPECT_EQ(server.counted(Reason::connectionAtTheEnd), 1u);
+  EXPECT_EQ(server.counted(Reason::unentitledConnection), 0u);
+}
+
 TEST(DBusServer, DescribesARefusedConnectionWithTheCommandThatTellsWhy) {
   Server server;
   {

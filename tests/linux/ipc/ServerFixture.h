@@ -157,6 +157,7 @@ class Server final : public ListenerDelegate {
     std::filesystem::remove_all(folder);
   }
   bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
+    if (ending) return false;
     const bool entitled = connection->entitlementValue("com.vantu.private.kytreportingd").boolValue();
     log.debug("offered: %s", connection->description().c_str());
     if (!entitled) return false;
@@ -196,6 +197,7 @@ class Server final : public ListenerDelegate {
   FixedEntitlements entitlements;
   std::atomic<int> accepted{0}, invalidations{0};
   std::atomic<bool> keepsNothing{false};
+  std::atomic<bool> ending{false};  // takes nobody any more
   WorkerPool pool{WorkerPoolOptions{}};
   std::unique_ptr<EpollReactor> reactor;
   std::unique_ptr<DBusServer> listener;
