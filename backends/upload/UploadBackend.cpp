@@ -1,6 +1,8 @@
 #include "backends/upload/UploadBackend.h"
 
+#include <algorithm>
 #include <cctype>
+#include <charconv>
 #include <cinttypes>
 #include <cstdio>
 #include <utility>
@@ -23,18 +25,44 @@ namespace {
 
 constexpr char kDescription[] = "Vidcall AFRC log";
 
-// A scheme, a host and nothing that cannot stand in an address.
+// What follows a host: nothing, or a colon and a port.
+bool isPort(std::string_view text) {
+  if (text.empty()) return true;
+  if (text.front() != ':') return false;
+  text.remove_prefix(1);
+  uint16_t port = 0;
+  const char* const end = text.data() + text.size();
+  const auto [stopped, error] = std::from_chars(text.data(), end, port);
+  return text.empty() || (error == std::errc() && stopped == end);
+}
+
+bool isHostAndPort(std::string_view authority) {
+  if (const size_t user = authority.rfind('@'); user != authority.npos) authority.remove_prefix(user + 1);
+  if (authority.starts_with('[')) {
+    const size_t end = authority.find(']');
+    return end != authority.npos && end > 1 && isPort(authority.substr(end + 1));
+  }
+  const size_t end = std::min(authority.find(':'), authority.size());
+  return end > 0 && isPort(authority.substr(end));
+}
+
+// A scheme, a host, perhaps a port, and nothing that cannot stand in an address.
 bool isAddress(std::string_view url) {
   const size_t scheme = url.find("://");
   if (scheme == url.npos) return false;
   std::string name(url.substr(0, scheme));
   for (char& c : name) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
   if (name != "https" && name != "http") return false;
+  for (size_t i = 0; i < url.size(); ++i) {
+    const auto c = static_cast<unsigned char>(url[i]);
+    if (c <= ' ' || c == 0x7f) return false;
+    const bool escapes = c == '%';
+    if (escapes && (i + 2 >= url.size() || std::isxdigit(static_cast<unsigned char>(url[i + 1])) == 0 ||
+                    std::isxdigit(static_cast<unsigned char>(url[i + 2])) == 0))
+      return false;
+  }
   const std::string_view rest = url.substr(scheme + 3);
-  if (rest.empty() || rest.front() == '/' || rest.front() == '?') return false;
-  for (const char c : url)
-    if (static_cast<unsigned char>(c) <= ' ' || c == 0x7f) return false;
-  return true;
+  return isHostAndPort(rest.substr(0, rest.find_first_of("/?#")));
 }
 
 }  // namespace
@@ -147,7 +175,6 @@ std::optional<Data> UploadBackend::compressedFile(FileAccess& file) {
 }
 
 std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, Data body) const {
-  if (!isAddress(*uploadURL_)) return std::nullopt;
   URLRequest request;
   request.method = "POST";
   const std::string compressedName = std::string(fileName) + ".gz";
@@ -155,6 +182,8 @@ std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, D
       "%@?uuid=%s&sequence=%u&description=%@%%20(Uploaded%%20by%%20TQS)&filename=%@&raw=true",
       {*uploadURL_, String(udid_ != nullptr ? udid_ : ""), sessionID_,
        String(percentEncodedForQuery(kDescription)), String(percentEncodedForQuery(compressedName))});
+  // The whole of it: what "post_url" says may become an address, or stop being one, by what follows it.
+  if (!isAddress(request.url)) return std::nullopt;
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
   request.body = std::move(body);
   request.isAwaited = true;

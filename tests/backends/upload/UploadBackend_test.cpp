@@ -275,8 +275,10 @@ TEST_F(Upload, AFileThatCannotBeCompressedIsRefused) {
 }
 
 TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
-  for (const char* url : {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "https://?a",
-                          "http://a b/", "http://a\x7f/", "://a/"}) {
+  for (const char* url :
+       {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "https://?a", "http://a b/",
+        "http://a\x7f/", "://a/", "https://a:70000/", "https://a:in/", "https://user@/in", "https://[::1",
+        "https://[]/", "https://:443/", "https://a/%", "https://a/%4", "https://a/%zz"}) {
     backend_ = nullptr;
     platform_.sink.clear();
     profile_.set("post_url", url);
@@ -285,6 +287,18 @@ TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
         << url;
   }
   EXPECT_TRUE(poster_->requests.empty());
+}
+
+// Not what "post_url" says alone.
+TEST_F(Upload, TheFinishedAddressIsJudged) {
+  for (const char* url : {"https://upload.example.org", "https://a:/in", "https://[2001:db8::1]:8443/in",
+                          "https://user:word@a:443", "https://a/x%20y"}) {
+    backend_ = nullptr;
+    platform_.sink.clear();
+    profile_.set("post_url", url);
+    EXPECT_TRUE(upload()) << url;
+  }
+  EXPECT_EQ(poster_->requests.size(), 5u);
 }
 
 TEST_F(Upload, ASchemeMayBeInCapitals) {
