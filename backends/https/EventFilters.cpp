@@ -8,16 +8,20 @@ namespace kyt {
 
 namespace {
 
-// A number below kShapes for the length and both ends of a key, the same for keys that differ in case alone.
+// A number below kShapes for the length and both ends of a key. ASCII ends that differ in case alone have the same; ends
+// of which one is not ASCII have none.
+[[gnu::always_inline]] inline size_t shapeOf(size_t size, uint32_t ends) {
+  static_assert(EventFilters::kShapes == 1024);
+  return ((static_cast<uint32_t>(size) << 16 | ends) * 0x9E3779B1u) >> 22;
+}
+[[gnu::always_inline]] inline uint32_t endsOf(std::string_view key) {
+  const auto byte = [](char c) { return uint32_t{static_cast<unsigned char>(c)}; };
+  const uint32_t ends = byte(key.front()) << 8 | byte(key.back());
+  return (ends & 0x8080u) == 0 ? ends | 0x2020u : 0;
+}
 // Most keys of a record are about no filter, and this is what they cost.
 [[gnu::always_inline]] inline size_t shapeOf(std::string_view key) {
-  if (key.empty()) return 0;
-  const auto byte = [](char c) { return uint32_t{static_cast<unsigned char>(c)}; };
-  uint32_t ends = byte(key.front()) << 8 | byte(key.back());
-  // A fold neither makes a character ASCII nor keeps one from being it; what it makes of others does not count.
-  ends = (ends & 0x8080u) == 0 ? ends | 0x2020u : 0;
-  static_assert(EventFilters::kShapes == 256);
-  return ((static_cast<uint32_t>(key.size()) << 16 | ends) * 0x9E3779B1u) >> 24;
+  return key.empty() ? 0 : shapeOf(key.size(), endsOf(key));
 }
 
 template <typename Matches>
@@ -87,7 +91,8 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
       const Value* key = dictionary->find("key");
       if (key != nullptr && key->string() != nullptr) {
         filter.foldedKey = foldCase(*key->string());
-        keyShapes_.set(shapeOf(*filter.foldedKey));
+        filter.sizes = unfoldedSizes(*filter.foldedKey);
+        addShapes(filter);
       }
       const Value* action = dictionary->find("action");
       const String* name = action != nullptr ? action->string() : nullptr;
@@ -98,9 +103,20 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   }
 }
 
+// Of every key that folds to the filter's. There are few: the letters with forms of other lengths are rare.
+void EventFilters::addShapes(const Filter& filter) {
+  if (filter.foldedKey->empty()) keyShapes_.set(shapeOf(*filter.foldedKey));
+  if (filter.foldedKey->empty()) return;
+  const uint32_t ends = endsOf(*filter.foldedKey);
+  for (size_t size = filter.sizes.least; size <= filter.sizes.most; ++size) {
+    if (filter.sizes.endsMayBeASCII) keyShapes_.set(shapeOf(size, ends));
+    if (filter.sizes.endsMayBeNonASCII) keyShapes_.set(shapeOf(size, 0));
+  }
+}
+
 EventFilters::Action EventFilters::actionForKey(std::string_view key, const Numbers& numbers) const {
   for (const Filter& filter : filters_) {
-    if (!filter.foldedKey || filter.foldedKey->size() != key.size()) continue;
+    if (!filter.foldedKey || key.size() < filter.sizes.least || key.size() > filter.sizes.most) continue;
     if (filter.method >= 0 && filter.method != numbers.method) continue;
     if (filter.status >= 0 && filter.status != numbers.status) continue;
     if (equalsFolded(key, *filter.foldedKey)) return filter.action;

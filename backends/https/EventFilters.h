@@ -14,6 +14,7 @@
 #include <string_view>
 #include <vector>
 
+#include "backend/Text.h"
 #include "platform/Function.h"
 #include "platform/Value.h"
 
@@ -27,7 +28,7 @@ namespace kyt {
 
 class EventFilters {
  public:
-  static constexpr size_t kShapes = 256;
+  static constexpr size_t kShapes = 1024;
   enum class Action : int32_t { keep = 0, remove = 1, sha256 = 2 };
   // The text of the digest of a text.
   using Digest = Function<String(const String&)>;
@@ -45,10 +46,12 @@ class EventFilters {
     int32_t status = -1;  // negative: any
     Action action = Action::keep;
     std::optional<std::string> foldedKey;  // none: takes its place in the table and is about no key
+    UnfoldedSizes sizes;                   // of the keys that fold to it
   };
   struct Numbers {
     int32_t method, status;  // of the record
   };
+  void addShapes(const Filter& filter);
   [[nodiscard]] Action actionForKey(std::string_view key, const Numbers& numbers) const;
   [[nodiscard]] bool mustRemove(const Dictionary& event, const String& key, Value& value,
                                 std::optional<Numbers>& numbers, Digest& digest) const;

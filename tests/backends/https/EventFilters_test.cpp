@@ -60,6 +60,23 @@ TEST_F(EventFiltersTest, ActionsAreComparedWithCase) {
 
 TEST_F(EventFiltersTest, KeysOfAnyAlphabetAreComparedWithoutCase) {
   EXPECT_TRUE(filtered({filter("Größe", "remove")}, {{"GRÖßE", 1}}).empty());
+  EXPECT_TRUE(filtered({filter("địa chỉ", "remove")}, {{"ĐỊA CHỈ", 1}}).empty());
+  EXPECT_TRUE(filtered({filter("ĐỊA CHỈ", "remove")}, {{"địa chỉ", 1}}).empty());
+}
+
+// The Kelvin sign is a k of three bytes, the long s one of two, Ⱥ is one byte shorter than ⱥ.
+TEST_F(EventFiltersTest, KeysThatTakeOtherNumbersOfBytesAreTheSameToo) {
+  for (const char* key : {"to\u212Aen", "TO\u212AEN", "token", "TOKEN"})
+    EXPECT_TRUE(filtered({filter("Token", "remove")}, {{key, 1}}).empty()) << key;
+  for (const char* key : {"\u017Fecret", "SECRET"})
+    EXPECT_TRUE(filtered({filter("secret", "remove")}, {{key, 1}}).empty()) << key;
+  for (const char* key : {"di\u017Fk", "dis\u212A", "di\u017F\u212A", "DISK"})
+    EXPECT_TRUE(filtered({filter("disk", "remove")}, {{key, 1}}).empty()) << key;
+  for (const char* key : {"\u023A", "\u2C65"}) {
+    EXPECT_TRUE(filtered({filter("\u023A", "remove")}, {{key, 1}}).empty()) << key;
+    EXPECT_TRUE(filtered({filter("\u2C65", "remove")}, {{key, 1}}).empty()) << key;
+  }
+  EXPECT_FALSE(filtered({filter("disk", "remove")}, {{"dik", 1}}).empty());
 }
 
 TEST_F(EventFiltersTest, ChangesTheValueOfTheMethodOnlyAfterReadingIt) {
