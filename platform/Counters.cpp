@@ -60,6 +60,18 @@ const char* reasonName(Reason reason) {
       return "datagram-given-up";
     case Reason::batchFull:
       return "batch-full";
+    case Reason::consentMissing:
+      return "consent-missing";
+    case Reason::countryNotListed:
+      return "country-not-listed";
+    case Reason::deviceNotListed:
+      return "device-not-listed";
+    case Reason::clientNotListed:
+      return "client-not-listed";
+    case Reason::samplingThresholdMissing:
+      return "sampling-threshold-missing";
+    case Reason::sampledOut:
+      return "sampled-out";
     case Reason::eventDroppedByState:
       return "event-dropped-by-state";
     case Reason::batchDiscarded:

@@ -41,9 +41,16 @@ enum class Reason : uint8_t {
   datagramUnacknowledged,    // … after its last retransmission
   datagramGivenUp,           // … with its back end
   batchFull,                 // an event dropped because its back end's batch is full
-  eventDroppedByState,       // a disabled back end dropped an event
-  batchDiscarded,            // records discarded with a batch whose back end is not enabled
-  batchedEventFiltered,      // records rejected by the lists at a flush
+  // Decisions that a back end posts nothing, or nothing for now; the events count where they are dropped.
+  consentMissing,
+  countryNotListed,
+  deviceNotListed,
+  clientNotListed,
+  samplingThresholdMissing,
+  sampledOut,
+  eventDroppedByState,   // a disabled back end dropped an event
+  batchDiscarded,        // records discarded with a batch whose back end is not enabled
+  batchedEventFiltered,  // records rejected by the lists at a flush
   // Of what stands in a post, each event, and each file or log data, counts.
   postWithoutURL,
   postWithoutPoster,  // the session was gone: nothing was sent

@@ -25,6 +25,7 @@
 #include "backend/KYTReportingBackend.h"
 #include "backends/https/EventFilters.h"
 #include "config/Configuration.h"
+#include "platform/Counters.h"
 
 namespace kyt {
 
@@ -121,6 +122,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] bool passesConsent(const Dictionary& entry);
   [[nodiscard]] bool passesLists(const Dictionary& entry, const String* country) const;
   [[nodiscard]] int32_t decideBySampling(const Dictionary& entry, const String* country);
+  void tellWhyNot(Reason reason, const char* why) const;
   void takeSettings(const Dictionary& entry, const Client& client, int32_t state);
   [[nodiscard]] String getPersistentIdentifierForCustomClientIDSuffix(const Client& client);
 

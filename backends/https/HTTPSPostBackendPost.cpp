@@ -7,6 +7,7 @@
 #include "config/ClientTypes.h"
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
+#include "platform/Clock.h"
 #include "platform/Counters.h"
 #include "platform/Cryptography.h"
 #include "platform/DataServices.h"
@@ -46,6 +47,7 @@ struct Reply {
   String name;
   FlushCompletion completion;
   size_t events;
+  std::string address;  // without what a "?" begins
 
   void operator()(std::optional<Data>, std::optional<URLResponse> response, std::optional<Error> error) {
     if (error) {
@@ -54,8 +56,8 @@ struct Reply {
                          error->localizedDescription.c_str());
     }
     const int status = response ? response->status : 0;
-    if (status >= 300 && status <= 399) count(Reason::requestRedirected, Reason::postRedirected);
-    if (status >= 400 && status <= 599) count(Reason::requestRefused, Reason::postRefused);
+    if (status >= 300 && status <= 399) tell(status, Reason::requestRedirected, Reason::postRedirected);
+    if (status >= 400 && status <= 599) tell(status, Reason::requestRefused, Reason::postRefused);
     if (status >= 500 && status <= 599) error = disable(status);
     if (completion) completion(Value(), std::move(error));
   }
@@ -63,6 +65,15 @@ struct Reply {
   void count(Reason request, Reason lost) {
     platform.counters.add(request);
     platform.counters.add(lost, events);
+  }
+
+  // What switches the back end off has a line of its own.
+  void tell(int status, Reason request, Reason lost) {
+    platform.counters.add(request);
+    const bool mayLog = platform.counters.addAndMayLog(lost, platform.clock.monotonic(), events);
+    if (mayLog && status < 500)
+      platform.log.normal("postJSONMessage: %s answered with status %d, %zu events of backend %s are lost",
+                          address.c_str(), status, events, name.c_str());
   }
 
   Error disable(int status) {
@@ -208,8 +219,10 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
     platform_.counters.add(Reason::postWithoutPoster, events);
     return;
   }
+  std::string address = request.url.substr(0, request.url.find('?'));
   delegate->postURLRequestWithCompletionHandler(
-      std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion), events});
+      std::move(request),
+      Reply{weak_from_this(), platform_, name_, std::move(completion), events, std::move(address)});
 }
 
 }  // namespace kyt

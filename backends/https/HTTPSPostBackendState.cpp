@@ -129,6 +129,7 @@ int32_t HTTPSPostBackend::updateBackendState() {
   if (!hasUserInfo()) return kBackendStateUndecided;
   const std::optional<String> country = platform_.deviceProperties.countryCode();
   const Dictionary* entry = chosenEntry(*clients, client);
+  if (entry == nullptr) tellWhyNot(Reason::clientNotListed, "no entry of the storebag is for this client");
   if (entry == nullptr || !passesRules(*entry, country ? &*country : nullptr)) return kBackendStateDisabled;
   const int32_t state = decideBySampling(*entry, country ? &*country : nullptr);
   takeSettings(*entry, client, state);
@@ -193,6 +194,7 @@ bool HTTPSPostBackend::passesConsent(const Dictionary& entry) {
   dnuType_ = 0;
   if (dnuEnabled_) return true;
   platform_.log.debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.", overrideDnu);
+  tellWhyNot(Reason::consentMissing, "the user has not given consent");
   return false;
 }
 
@@ -205,6 +207,7 @@ bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* countr
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
                 shown(country).c_str(), shown(locales).c_str());
+    tellWhyNot(Reason::countryNotListed, "the storebag's entry does not list this country");
     return false;
   }
   const String* family = productFamily_ ? &*productFamily_ : nullptr;
@@ -213,6 +216,7 @@ bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* countr
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s",
                 shown(family).c_str(), shown(devices).c_str());
+    tellWhyNot(Reason::deviceNotListed, "the storebag's entry does not list this device");
     return false;
   }
   const String* hardware = hardwareType_ ? &*hardwareType_ : nullptr;
@@ -221,6 +225,7 @@ bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* countr
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s",
                 shown(hardware).c_str(), shown(excluded).c_str());
+    tellWhyNot(Reason::deviceNotListed, "the storebag's entry excludes this device");
     return false;
   }
   return true;
@@ -238,8 +243,12 @@ int32_t HTTPSPostBackend::decideBySampling(const Dictionary& entry, const String
     threshold = std::move(changed);
   }
   setSamplingThreshold(threshold);
-  if (threshold.isNull()) return kBackendStateDisabled;
+  if (threshold.isNull()) {
+    tellWhyNot(Reason::samplingThresholdMissing, "the storebag's entry has no sampling_threshold");
+    return kBackendStateDisabled;
+  }
   if (samplingFactor_ <= threshold.doubleValue()) return kBackendStateEnabled;
+  tellWhyNot(Reason::sampledOut, "this session was not drawn");
   const Value* second = entry.find("override_sampling");
   overrideSampling_ = second != nullptr ? *second : Value();
   // "Greater than" and no other test: an override that is not a number holds the back end.
@@ -268,6 +277,14 @@ void HTTPSPostBackend::takeSettings(const Dictionary& entry, const Client& clien
                      {Value(name_), Value(*list)});
   }
   shouldUseWiFiOnly_ = intEntry(entry, "use_wifi_only") != 0;
+}
+
+// Each decision's own line is at the debug level; whoever runs the device sees one a minute without it.
+void HTTPSPostBackend::tellWhyNot(Reason reason, const char* why) const {
+  if (!platform_.counters.addAndMayLog(reason, platform_.clock.monotonic())) return;
+  platform_.log.normal("HTTPSPostBackend(updateBackendState): %s posts nothing of %s:%s, since %s",
+                       name_.c_str(), shown(userInfoText(kKYTReportingUserInfoClientName)).c_str(),
+                       shown(userInfoText(kKYTReportingUserInfoServiceName)).c_str(), why);
 }
 
 String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Client& client) {

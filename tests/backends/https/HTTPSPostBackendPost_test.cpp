@@ -485,5 +485,27 @@ TEST_F(LostPosts, CountEventsThatLeaveTheirMessageForWantOfAClientID) {
   EXPECT_EQ(dropped(Reason::postWithoutClientID), 2u);
 }
 
+TEST_F(LostPosts, AreToldOnceAMinuteWithStatusAndAddress) {
+  entry_.set("post_url", "https://post.example.org/events?key=secret");
+  const std::string line =
+      "postJSONMessage: https://post.example.org/events answered with status 404, 2 events of backend "
+      "httppost are lost";
+  flushTwo();
+  poster_->answer(0, 404);
+  flushTwo();
+  poster_->answer(1, 404);
+  EXPECT_EQ(platform_.sink.count(LogLevel::normal, line), 1u);
+  platform_.clock.advance(std::chrono::seconds(61));
+  flushTwo();
+  poster_->answer(2, 404);
+  EXPECT_EQ(platform_.sink.count(LogLevel::normal, line), 2u);
+  flushTwo();
+  poster_->answer(3, 302);
+  EXPECT_TRUE(platform_.sink.contains(LogLevel::normal, "answered with status 302"));
+  flushTwo();
+  poster_->answer(4, 200);
+  EXPECT_EQ(platform_.sink.count("answered with status"), 3u);
+}
+
 }  // namespace
 }  // namespace kyt

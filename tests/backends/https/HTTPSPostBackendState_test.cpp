@@ -554,5 +554,62 @@ TEST_F(HTTPSPostBackendState, NoTypeInTheEntryDoesHarm) {
   }
 }
 
+// Each decision against posting is told at the default level, with whom it is about, once a minute.
+class ToldDecisions : public HTTPSPostBackendState {
+ protected:
+  void expectTold(Reason reason, const std::string& why) {
+    for (int i = 0; i < 2; ++i) {
+      backend_.reset();
+      decided();
+    }
+    EXPECT_EQ(dropped(reason), 2u);
+    EXPECT_EQ(platform_.sink.count(
+                  LogLevel::normal,
+                  "HTTPSPostBackend(updateBackendState): httppost posts nothing of a:b, since " + why),
+              1u)
+        << why;
+  }
+};
+
+TEST_F(ToldDecisions, NameTheConsent) {
+  platform_.consent.setAllowed(false);
+  expectTold(Reason::consentMissing, "the user has not given consent");
+}
+
+TEST_F(ToldDecisions, NameTheCountry) {
+  platform_.deviceProperties.setCountryCode("FR");
+  expectTold(Reason::countryNotListed, "the storebag's entry does not list this country");
+}
+
+TEST_F(ToldDecisions, NameTheDevice) {
+  entry_.set("device_whitelist", Array{"Watch"});
+  expectTold(Reason::deviceNotListed, "the storebag's entry does not list this device");
+}
+
+TEST_F(ToldDecisions, NameTheExcludedDevice) {
+  entry_.set("device_blacklist", Array{"Phone9"});
+  expectTold(Reason::deviceNotListed, "the storebag's entry excludes this device");
+}
+
+TEST_F(ToldDecisions, NameTheClientThatNoEntryIsFor) {
+  entry_.set("client", "another");
+  expectTold(Reason::clientNotListed, "no entry of the storebag is for this client");
+}
+
+TEST_F(ToldDecisions, NameAMissingThreshold) {
+  entry_.remove("sampling_threshold");
+  expectTold(Reason::samplingThresholdMissing, "the storebag's entry has no sampling_threshold");
+}
+
+TEST_F(ToldDecisions, NameTheDraw) {
+  entry_.set("sampling_threshold", -1.0);
+  expectTold(Reason::sampledOut, "this session was not drawn");
+}
+
+TEST_F(ToldDecisions, AreNoneOfABackEndThatPosts) {
+  decided();
+  EXPECT_EQ(platform_.sink.count("posts nothing"), 0u);
+}
+
 }  // namespace
 }  // namespace kyt
