@@ -120,7 +120,7 @@ std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::opti
   }
 
   maxAge = maxAgeFromCacheControl(reply.response->header("Cache-Control"));
-  const std::optional<std::string_view> modified = reply.response->header("Last-Modified");
+  const std::optional<std::string> modified = reply.response->header("Last-Modified");
   if (lastModified != nullptr && modified) {
     if (conditional && (!reply.data || reply.data->empty())) {
       log.debug("fetchStorebagWithName: storebag content has not changed. using its cached version");

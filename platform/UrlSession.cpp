@@ -7,13 +7,16 @@
 
 namespace kyt {
 
-std::optional<std::string_view> URLResponse::header(std::string_view name) const {
+std::optional<std::string> URLResponse::header(std::string_view name) const {
   const auto sameLetter = [](char a, char b) {
     return std::tolower(static_cast<unsigned char>(a)) == std::tolower(static_cast<unsigned char>(b));
   };
-  for (const auto& [key, value] : headers)
-    if (std::equal(key.begin(), key.end(), name.begin(), name.end(), sameLetter)) return value;
-  return std::nullopt;
+  std::optional<std::string> all;
+  for (const auto& [key, value] : headers) {
+    if (!std::equal(key.begin(), key.end(), name.begin(), name.end(), sameLetter)) continue;
+    all = all ? *all + ", " + value : value;
+  }
+  return all;
 }
 
 size_t OutstandingBytes::of(const URLRequest& request) {

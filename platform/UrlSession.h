@@ -45,11 +45,12 @@ struct URLResponse {
   int status = 0;
   std::vector<std::pair<std::string, std::string>>
       headers;  // of the last response, in order, names as received
-  // The first header of that name, compared without case.
-  [[nodiscard]] std::optional<std::string_view> header(std::string_view name) const;
+  // The value of that name, compared without case; of several lines of it all values, with ", " between them.
+  [[nodiscard]] std::optional<std::string> header(std::string_view name) const;
 };
 
-// (data, response, error): with an error there is no response, and data is empty.
+// (data, response, error): with an error there is no data; there is a response when its status line had come, and of its
+// headers what had come by then. The status a server has decided on counts even if its reply breaks off.
 using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
 
 struct URLSessionConfiguration {

@@ -50,14 +50,16 @@ struct Reply {
   std::string address;  // without what a "?" begins
 
   void operator()(std::optional<Data>, std::optional<URLResponse> response, std::optional<Error> error) {
+    const int status = response ? response->status : 0;
+    const bool redirected = status >= 300 && status <= 399;
+    const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
     if (error) {
-      count(Reason::requestFailed, Reason::postFailed);
+      if (!redirected && !refused) count(Reason::requestFailed, Reason::postFailed);
       platform.log.error("HTTPSPostBackend(postJsonMessage): post error: %s",
                          error->localizedDescription.c_str());
     }
-    const int status = response ? response->status : 0;
-    if (status >= 300 && status <= 399) tell(status, Reason::requestRedirected, Reason::postRedirected);
-    if (status >= 400 && status <= 599) tell(status, Reason::requestRefused, Reason::postRefused);
+    if (redirected) tell(status, Reason::requestRedirected, Reason::postRedirected);
+    if (refused) tell(status, Reason::requestRefused, Reason::postRefused);
     if (status >= 500 && status <= 599) error = disable(status);
     if (completion) completion(Value(), std::move(error));
   }

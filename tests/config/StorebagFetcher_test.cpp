@@ -118,6 +118,12 @@ TEST_F(StorebagFetcherTest, TakesOverAndSendsBackTheModificationDate) {
       "fetchStorebagWithName: Adding 'Last-Modified: Mon, 1 Jan 2026 00:00:00 GMT' to the header"));
 }
 
+TEST_F(StorebagFetcherTest, TakesTheMaximumAgeFromAnyOfSeveralLines) {
+  serveBag(bag_, {{"Cache-Control", "public"}, {"Cache-Control", "max-age=60"}});
+  EXPECT_TRUE(fetch());
+  EXPECT_EQ(maxAge_, 60);
+}
+
 TEST_F(StorebagFetcherTest, ReportsAnUnchangedBag) {
   lastModified_ = String("yesterday");
   serve({304, {{"Last-Modified", "yesterday"}, {"Cache-Control", "max-age=60"}}, "", std::nullopt});

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <cstring>
 
 #include "platform/Limits.h"
@@ -37,6 +38,15 @@ std::string withoutControls(std::string_view text) {
   return result;
 }
 
+// Of a line as in "HTTP/1.1 200 OK"; 0 of one that is only preliminary.
+int statusOf(std::string_view line) {
+  int status = 0;
+  line.remove_prefix(std::min(line.find(' '), line.size()));
+  line.remove_prefix(std::min(line.find_first_not_of(' '), line.size()));
+  (void)std::from_chars(line.data(), line.data() + line.size(), status);
+  return status >= 200 ? status : 0;
+}
+
 }  // namespace
 
 URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, URLRequest wanted, URLCompletion completion)
@@ -58,7 +68,8 @@ void URLTransfer::cancel() {
 void URLTransfer::deliver() {
   // What the completion holds is gone before anyone who waits for the last request goes on.
   if (URLCompletion completion = std::move(completion_)) {
-    completion(std::move(data_), error_ ? std::nullopt : std::optional(std::move(response_)),
+    const bool answered = !error_ || response_.status != 0;
+    completion(std::move(data_), answered ? std::optional(std::move(response_)) : std::nullopt,
                std::move(error_));
   }
   session->network->completionHasRun();
@@ -71,7 +82,10 @@ void URLTransfer::takeReply(int status) {
 }
 
 void URLTransfer::takeError(int32_t code, std::string description) {
+  URLResponse response = std::move(response_);
   clearReply();
+  const bool isOnTheWay = request.maxRedirects > 0 && response.status / 100 == 3;
+  if (!isOnTheWay) response_ = std::move(response);
   error_.emplace(Error{kKYTURLErrorDomain, code, std::move(description)});
 }
 
@@ -168,7 +182,7 @@ size_t URLTransfer::receiveHeader(char* bytes, size_t size, size_t count, void* 
   self.replyTooLong = self.headerBytes_ > kMaxReplyHeaderBytes;
   if (self.replyTooLong) return 0;
   if (line.starts_with("HTTP/")) {  // a redirect's or an interim reply's headers are forgotten
-    self.response_.headers.clear();
+    self.response_ = {statusOf(line), {}};
     return line.size();
   }
   const bool isTrailer = !self.body_.empty();

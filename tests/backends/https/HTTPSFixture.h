@@ -27,6 +27,12 @@ class RecordingPoster final : public ReportingSessionConnectivityInterface {
     response.status = status;
     completions.at(index)(Data(), response, std::nullopt);
   }
+  // A reply that breaks off after its status.
+  void breakOff(size_t index, int status, Error error) {
+    URLResponse response;
+    response.status = status;
+    completions.at(index)(std::nullopt, response, std::move(error));
+  }
   void fail(size_t index, Error error) {
     completions.at(index)(std::nullopt, std::nullopt, std::move(error));
   }

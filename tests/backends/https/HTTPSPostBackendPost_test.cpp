@@ -396,6 +396,25 @@ TEST_F(HTTPSPostBackendPost, ATransportErrorIsLoggedCountedAndPassedOn) {
                                       "HTTPSPostBackend(postJsonMessage): post error: no connection"));
 }
 
+TEST_F(HTTPSPostBackendPost, AStatusWithATransportErrorTogetherCountsAsTheStatusAndLogsBoth) {
+  const Error error{kKYTURLErrorDomain, 18, "cut"};
+  decided();
+  FlushAnswer ok, refused;
+  post("{}", 0, ok.completion());
+  poster_->breakOff(0, 200, error);
+  EXPECT_EQ(ok.error, error);
+  EXPECT_EQ(backend().state(), kBackendStateEnabled);
+  EXPECT_EQ(dropped(Reason::postFailed), 1u);
+  post("{}", 0, refused.completion());
+  poster_->breakOff(1, 503, error);
+  EXPECT_EQ(backend().state(), kBackendStateDisabled);
+  EXPECT_EQ(refused.error,
+            (Error{kKYTReportingErrorDomain, 503, "backend httppost disabled by server 503 return code"}));
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, "HTTPSPostBackend(postJsonMessage): post error: cut"), 2u);
+  EXPECT_EQ(dropped(Reason::postFailed), 1u) << "one request counts once";
+  EXPECT_EQ(dropped(Reason::postRefused), 1u);
+}
+
 TEST_F(HTTPSPostBackendPost, AReplyWithoutACompletionIsTakenToo) {
   decided();
   post("{}");

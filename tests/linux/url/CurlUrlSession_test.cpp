@@ -493,7 +493,7 @@ TEST_F(CurlURLSession, EndsARequestAtItsTimeOutProgressOrNot) {
   EXPECT_EQ(outcome.errorText(), "The request timed out");
   EXPECT_GE(std::chrono::steady_clock::now() - before, 400ms);
   EXPECT_FALSE(outcome.data());
-  EXPECT_FALSE(outcome.response());
+  EXPECT_EQ(outcome.status(), 200);
 }
 
 TEST_F(CurlURLSession, TakesAReplyOfTheGreatestSizeAndRefusesALargerOne) {
@@ -524,10 +524,42 @@ TEST_F(CurlURLSession, ReportsRepliesThatBreakOff) {
   const Outcome partial = perform(*urls, get(server_.url("/")));
   EXPECT_EQ(partial.errorCode(), CURLE_PARTIAL_FILE);
   EXPECT_FALSE(partial.data());
-  EXPECT_FALSE(partial.response());
+  EXPECT_EQ(partial.status(), 200);
   server_.setReply(reply(Behaviour::close));
   EXPECT_EQ(perform(*urls, get(server_.url("/"))).errorCode(), CURLE_GOT_NOTHING);
   EXPECT_EQ(factory().figures().failed, 2u);
+}
+
+TEST_F(CurlURLSession, TellsTheStatusOfAReplyThatIsCutOrStallsOrIsTooLarge) {
+  options_.noProgressTimeout = 300ms;
+  auto urls = session();
+  const std::string head = "HTTP/1.1 100 Continue\r\n\r\nHTTP/1.1 503 Busy\r\nRetry-After: 9\r\n";
+  server_.setReply(reply(Behaviour::raw, head + "Content-Length: 9\r\n\r\ncut"));
+  const Outcome cut = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(cut.errorCode(), CURLE_PARTIAL_FILE);
+  EXPECT_EQ(cut.status(), 503);
+  EXPECT_EQ(cut.response()->header("Retry-After"), "9");
+  EXPECT_FALSE(cut.data());
+  server_.setReply({.status = 502, .body = "stalls", .behaviour = Behaviour::drip, .interval = 1h});
+  const Outcome stalled = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(stalled.errorCode(), CURLE_OPERATION_TIMEDOUT);
+  EXPECT_EQ(stalled.status(), 502);
+  server_.setReply({.status = 500, .headers = {{"Content-Length", "99999999"}}});
+  const Outcome large = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(large.errorCode(), CURLE_FILESIZE_EXCEEDED);
+  EXPECT_EQ(large.status(), 500);
+  // A preliminary status decides nothing.
+  server_.setReply(reply(Behaviour::raw, "HTTP/1.1 100 Continue\r\n\r\n"));
+  EXPECT_FALSE(perform(*urls, post(server_.url("/"), "x")).response());
+}
+
+TEST_F(CurlURLSession, HeaderLinesOfOneNameAreOne) {
+  server_.setReply(
+      {.headers = {{"Cache-Control", "public"}, {"X-Other", "1"}, {"cache-control", "max-age=60"}}});
+  const Outcome outcome = perform(*session(), get(server_.url("/")));
+  EXPECT_EQ(outcome.response()->header("Cache-Control"), "public, max-age=60");
+  EXPECT_EQ(outcome.response()->header("X-Other"), "1");
+  EXPECT_FALSE(outcome.response()->header("X-None"));
 }
 
 TEST_F(CurlURLSession, ReportsGarbage) {
