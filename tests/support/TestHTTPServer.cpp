@@ -44,12 +44,29 @@ std::string head(const TestHTTPServer::Reply& reply, bool withLength) {
   return text + "\r\n";
 }
 
+// "::1" and its like have colons.
+sockaddr_storage addressOf(const std::string& text, uint16_t port) {
+  sockaddr_storage address{};
+  auto& four = reinterpret_cast<sockaddr_in&>(address);
+  auto& six = reinterpret_cast<sockaddr_in6&>(address);
+  address.ss_family = text.find(':') == text.npos ? AF_INET : AF_INET6;
+  four.sin_port = htons(port);  // at the same place in both
+  if (address.ss_family == AF_INET) {
+    inet_pton(AF_INET, text.c_str(), &four.sin_addr);
+  } else {
+    inet_pton(AF_INET6, text.c_str(), &six.sin6_addr);
+  }
+  return address;
+}
+
 std::string peerOf(int socket) {
-  sockaddr_in address{};
+  sockaddr_storage address{};
   socklen_t size = sizeof address;
-  char text[INET_ADDRSTRLEN] = {};
+  char text[INET6_ADDRSTRLEN] = {};
   if (getpeername(socket, reinterpret_cast<sockaddr*>(&address), &size) != 0) return {};
-  return inet_ntop(AF_INET, &address.sin_addr, text, sizeof text);
+  if (address.ss_family == AF_INET6)
+    return inet_ntop(AF_INET6, &reinterpret_cast<sockaddr_in6&>(address).sin6_addr, text, sizeof text);
+  return inet_ntop(AF_INET, &reinterpret_cast<sockaddr_in&>(address).sin_addr, text, sizeof text);
 }
 
 using Context = std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)>;
@@ -97,6 +114,15 @@ class Stream {
     if (count <= 0) return false;
     buffer.append(bytes, static_cast<size_t>(count));
     return true;
+  }
+  void reset() const {
+    sockaddr none{};
+    none.sa_family = AF_UNSPEC;
+    connect(socket_, &none, sizeof none);
+  }
+  void endWriting() {
+    if (ssl_ != nullptr) SSL_shutdown(ssl_);
+    shutdown(socket_, SHUT_WR);
   }
   bool write(std::string_view bytes) {
     while (!bytes.empty()) {
@@ -159,18 +185,15 @@ class TestHTTPServer::Implementation {
  public:
   explicit Implementation(Options options) : options_(std::move(options)), context_(makeContext(options_)) {
     signal(SIGPIPE, SIG_IGN);  // TLS writes to a connection that the client closed
-    listener_ = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_storage address = addressOf(options_.address, options_.port);
+    listener_ = socket(address.ss_family, SOCK_STREAM | SOCK_CLOEXEC, 0);
     const int on = 1;
     setsockopt(listener_, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(options_.port);
-    inet_pton(AF_INET, options_.address.c_str(), &address.sin_addr);
     socklen_t size = sizeof address;
     if (bind(listener_, reinterpret_cast<sockaddr*>(&address), size) != 0 || listen(listener_, 1024) != 0 ||
         getsockname(listener_, reinterpret_cast<sockaddr*>(&address), &size) != 0)
       throw std::runtime_error("TestHTTPServer: cannot listen on " + options_.address);
-    port_ = ntohs(address.sin_port);
+    port_ = ntohs(reinterpret_cast<sockaddr_in&>(address).sin_port);
     acceptor_ = std::thread([this] { acceptConnections(); });
   }
 
@@ -267,6 +290,9 @@ class TestHTTPServer::Implementation {
     switch (reply.behaviour) {
       case Behaviour::close:
         return false;
+      case Behaviour::reset:
+        stream.reset();
+        return false;
       case Behaviour::raw:
         stream.write(reply.body);
         return false;
@@ -281,6 +307,10 @@ class TestHTTPServer::Implementation {
         if (stopping_) return false;
         break;
       }
+      case Behaviour::sayGoodbye:
+        if (!stream.write(head(reply, !bodyless) + reply.body)) return false;
+        stream.endWriting();
+        return true;
       case Behaviour::answer:
         break;
     }
@@ -330,8 +360,10 @@ uint16_t TestHTTPServer::port() const {
 
 std::string TestHTTPServer::url(std::string_view path, std::string_view host) const {
   const Options& options = implementation_->options_;
+  const bool isSix = options.address.find(':') != std::string::npos;
+  const std::string address = isSix ? "[" + options.address + "]" : options.address;
   return std::string(options.certificate ? "https://" : "http://") +
-         std::string(host.empty() ? std::string_view(options.address) : host) + ":" + std::to_string(port()) +
+         std::string(host.empty() ? std::string_view(address) : host) + ":" + std::to_string(port()) +
          std::string(path);
 }
 

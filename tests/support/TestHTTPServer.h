@@ -46,7 +46,9 @@ class TestHTTPServer {
     stopMidBody,  // announces the whole body, sends half of it and closes
     raw,          // sends `body` instead of a reply, byte for byte, and closes
     close,        // closes without a byte
+    reset,        // resets the connection without a byte
     drip,         // the body a byte at a time, `interval` apart
+    sayGoodbye,   // answers, ends its side of the connection, and goes on reading
   };
 
   struct Reply {
@@ -62,8 +64,8 @@ class TestHTTPServer {
   struct Options {
     std::optional<TestCertificate> certificate;  // then it speaks TLS
     int maximumTLSVersion = 0;                   // 0x0302 is TLS 1.1; 0: the newest
-    std::string address = "127.0.0.1";
-    uint16_t port = 0;  // 0: any free one
+    std::string address = "127.0.0.1";           // or one of IPv6
+    uint16_t port = 0;                           // 0: any free one
   };
 
   // Listens from here on; answers 200 without a body until a handler is set. Throws when it cannot.

@@ -139,8 +139,9 @@ allow = [
   "setsockopt(*, IPPROTO_IPV6, IPV6_RECVERR)", "setsockopt(*, IPPROTO_IPV6, IPV6_MTU_DISCOVER)",
   "setsockopt(*, IPPROTO_IPV6, IPV6_V6ONLY)",
   "setsockopt(*, SOL_NETLINK)",
-  # Questions to devices: how much can be read, whether this is a terminal, names and states of network interfaces
-  "ioctl(*, FIONREAD)", "ioctl(*, FIONBIO)", "ioctl(*, TCGETS)",
+  # Questions to devices: how much can be read or is still to be acknowledged, whether this is a terminal, names and
+  # states of network interfaces
+  "ioctl(*, FIONREAD)", "ioctl(*, FIONBIO)", "ioctl(*, SIOCOUTQ)", "ioctl(*, TCGETS)",
   "ioctl(*, SIOCGIFNAME)", "ioctl(*, SIOCGIFINDEX)", "ioctl(*, SIOCGIFFLAGS)",
 ]
 

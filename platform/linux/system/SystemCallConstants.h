@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <linux/netlink.h>
+#include <linux/sockios.h>
 #include <net/if.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
@@ -88,6 +89,7 @@ inline constexpr SystemCallConstant kSystemCallConstants[] = {
     KYT_CONSTANT(FIONREAD),
     KYT_CONSTANT(FIONBIO),
     KYT_CONSTANT(TCGETS),
+    KYT_CONSTANT(SIOCOUTQ),
     KYT_CONSTANT(SIOCGIFNAME),
     KYT_CONSTANT(SIOCGIFINDEX),
     KYT_CONSTANT(SIOCGIFFLAGS),

@@ -27,9 +27,15 @@ void RouteEvents::unsubscribe() {
   socket_ = -1;
 }
 
-void RouteEvents::takeAll() {
+bool RouteEvents::takeAll() {
+  if (socket_ < 0) return false;
   char bytes[16384];
-  while (recv(socket_, bytes, sizeof bytes, 0) >= 0 || errno == EINTR || errno == ENOBUFS) continue;
+  bool any = false;
+  for (;;) {
+    const bool came = recv(socket_, bytes, sizeof bytes, 0) >= 0 || errno == ENOBUFS;  // the latter: too many
+    any = any || came;
+    if (!came && errno != EINTR) return any;
+  }
 }
 
 }  // namespace kyt

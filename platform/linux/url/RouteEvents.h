@@ -1,6 +1,6 @@
 // Tells that something about the network changed: routes, addresses or links came or went. Subscribed only
-// while requests wait for connectivity, so that an idle daemon is not woken by every change. Network thread
-// only.
+// while there are connections or requests wait for connectivity, so that an idle daemon is not woken by every change.
+// Network thread only.
 #pragma once
 
 namespace kyt {
@@ -17,7 +17,8 @@ class RouteEvents {
   bool subscribe();
   void unsubscribe();
   [[nodiscard]] int descriptor() const { return socket_; }  // readable after an event; -1: not subscribed
-  void takeAll();                                           // forgets the events that came
+  // Forgets the events that came; whether there were any.
+  [[nodiscard]] bool takeAll();
 
  private:
   int socket_ = -1;

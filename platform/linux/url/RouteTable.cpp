@@ -32,8 +32,28 @@ struct RouteQuestion {
   }
 };
 
+// Only addresses: no ports.
+bool sameAddress(const sockaddr& a, const sockaddr_storage& b) {
+  if (a.sa_family != b.ss_family) return false;
+  if (a.sa_family == AF_INET)
+    return std::memcmp(&reinterpret_cast<const sockaddr_in&>(a).sin_addr,
+                       &reinterpret_cast<const sockaddr_in&>(b).sin_addr, 4) == 0;
+  return std::memcmp(&reinterpret_cast<const sockaddr_in6&>(a).sin6_addr,
+                     &reinterpret_cast<const sockaddr_in6&>(b).sin6_addr, 16) == 0;
+}
+
+void takeSource(const rtmsg& route, const rtattr* attribute, sockaddr_storage& source) {
+  source.ss_family = route.rtm_family;
+  if (route.rtm_family == AF_INET && RTA_PAYLOAD(attribute) == 4)
+    std::memcpy(&reinterpret_cast<sockaddr_in&>(source).sin_addr, RTA_DATA(attribute), 4);
+  else if (route.rtm_family == AF_INET6 && RTA_PAYLOAD(attribute) == 16)
+    std::memcpy(&reinterpret_cast<sockaddr_in6&>(source).sin6_addr, RTA_DATA(attribute), 16);
+  else
+    source.ss_family = AF_UNSPEC;
+}
+
 // The answer's interface when the route is one that carries packets.
-std::optional<int> usableInterface(const nlmsghdr* header) {
+std::optional<int> usableInterface(const nlmsghdr* header, sockaddr_storage* source) {
   if (header->nlmsg_type != RTM_NEWROUTE) return std::nullopt;  // an error: no route
   const auto* route = static_cast<const rtmsg*>(NLMSG_DATA(header));
   const bool carries = route->rtm_type == RTN_UNICAST || route->rtm_type == RTN_LOCAL ||
@@ -45,6 +65,7 @@ std::optional<int> usableInterface(const nlmsghdr* header) {
   for (const rtattr* attribute = RTM_RTA(route); RTA_OK(attribute, left);
        attribute = RTA_NEXT(attribute, left)) {
     if (attribute->rta_type == RTA_OIF) std::memcpy(&interface, RTA_DATA(attribute), sizeof interface);
+    if (attribute->rta_type == RTA_PREFSRC && source != nullptr) takeSource(*route, attribute, *source);
   }
   return interface;
 }
@@ -80,7 +101,7 @@ RouteTable::~RouteTable() {
   if (flagsSocket_ >= 0) close(flagsSocket_);
 }
 
-std::optional<int> RouteTable::lookUp(const sockaddr& address, int through) {
+std::optional<int> RouteTable::lookUp(const sockaddr& address, int through, sockaddr_storage* source) {
   if (address.sa_family != AF_INET && address.sa_family != AF_INET6) return 0;
   if (socket_ < 0) socket_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE);
   if (socket_ < 0) return 0;
@@ -117,12 +138,12 @@ std::optional<int> RouteTable::lookUp(const sockaddr& address, int through) {
     }
     const auto* header = reinterpret_cast<const nlmsghdr*>(answer);
     if (NLMSG_OK(header, static_cast<unsigned>(size)) && header->nlmsg_seq == sequence_)
-      return usableInterface(header);
+      return usableInterface(header, source);
   }
 }
 
-std::optional<int> RouteTable::usableRoute(const sockaddr& address, int through) {
-  const std::optional<int> interface = lookUp(address, through);
+std::optional<int> RouteTable::usableRoute(const sockaddr& address, int through, sockaddr_storage* source) {
+  const std::optional<int> interface = lookUp(address, through, source);
   return interface && hasCarrier(*interface) ? interface : std::nullopt;
 }
 
@@ -154,6 +175,18 @@ std::optional<std::string> RouteTable::interfaceAvoidingCellular(const sockaddr&
     if (usableRoute(address, index).has_value()) return one->if_name;
   }
   return std::nullopt;
+}
+
+RouteTable::Way RouteTable::wayOf(const sockaddr& local, const sockaddr& peer, const std::string& interface,
+                                  bool avoidCellular) {
+  if (avoidCellular) {
+    const std::optional<std::string> found = interfaceAvoidingCellular(peer);
+    if (!found) return Way::none;
+    return found->empty() || interface.empty() || *found == interface ? Way::same : Way::other;
+  }
+  sockaddr_storage source{};
+  if (!usableRoute(peer, 0, &source)) return Way::none;
+  return source.ss_family == AF_UNSPEC || sameAddress(local, source) ? Way::same : Way::other;
 }
 
 bool RouteTable::isCellular(const std::string& interface) const {

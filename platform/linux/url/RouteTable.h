@@ -9,6 +9,7 @@
 
 #include <sys/socket.h>
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <vector>
@@ -31,6 +32,11 @@ class RouteTable {
   // less preferred one when only this avoids cellular interfaces. Empty text: reachable, the interface is
   // unknown.
   [[nodiscard]] std::optional<std::string> interfaceAvoidingCellular(const sockaddr& address);
+  // How a connection to `peer` made now would leave, compared with one that is there between `local` and it, bound to
+  // `interface` (empty: to none).
+  enum class Way : uint8_t { same, other, none };
+  [[nodiscard]] Way wayOf(const sockaddr& local, const sockaddr& peer, const std::string& interface,
+                          bool avoidCellular);
   // Whether a name could be looked up: a name server that is not on this machine has a route, or one that is
   // here could ask others because there is a default route.
   [[nodiscard]] bool canResolve();
@@ -39,10 +45,11 @@ class RouteTable {
 
  private:
   // The outgoing interface's index of a route (0: unknown), or nothing. `through`: only this
-  // interface; 0: any.
-  [[nodiscard]] std::optional<int> lookUp(const sockaddr& address, int through);
+  // interface; 0: any. `source`: the address that packets leave from, when it is known.
+  [[nodiscard]] std::optional<int> lookUp(const sockaddr& address, int through, sockaddr_storage* source);
   // … of one whose cable is plugged in: the kernel keeps routes over links that lost their carrier.
-  [[nodiscard]] std::optional<int> usableRoute(const sockaddr& address, int through);
+  [[nodiscard]] std::optional<int> usableRoute(const sockaddr& address, int through,
+                                               sockaddr_storage* source = nullptr);
   [[nodiscard]] bool hasCarrier(int interface);
   [[nodiscard]] bool hasDefaultRoute();
 

@@ -1,6 +1,7 @@
 #include "platform/linux/url/UrlConnectionPool.h"
 
 #include <sys/epoll.h>
+#include <unistd.h>
 
 #include "platform/Limits.h"
 #include "platform/linux/url/UrlNetwork.h"
@@ -76,7 +77,6 @@ CURL* URLConnectionPool::takeHandle() {
   curl_.easySetOption(handle, CURLOPT_PROXY, "");  // nor one from the environment
   curl_.easySetOption(handle, CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
   curl_.easySetOption(handle, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
-  curl_.easySetOption(handle, CURLOPT_PIPEWAIT, 1L);  // a burst shares one HTTP/2 connection
   curl_.easySetOption(handle, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
   curl_.easySetOption(handle, CURLOPT_SSL_VERIFYPEER, 1L);
   curl_.easySetOption(handle, CURLOPT_SSL_VERIFYHOST, 2L);
@@ -92,8 +92,8 @@ CURL* URLConnectionPool::takeHandle() {
       std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
   curl_.easySetOption(handle, CURLOPT_MAXAGE_CONN, seconds(options.idleConnectionTime));
   curl_.easySetOption(handle, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(Limits::maxHTTPReplyBytes));
-  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETFUNCTION, URLNetwork::socketClosed);
-  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETDATA, &network_);
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETFUNCTION, socketClosed);
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETDATA, this);
   curl_.easySetOption(handle, CURLOPT_QUICK_EXIT, 1L);  // giving up a look-up of a name must not wait for it
   return handle;
 }
@@ -101,8 +101,10 @@ CURL* URLConnectionPool::takeHandle() {
 CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
   if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
+  transfer.pool = this;
   transfer.configure(handle);
   if (curl_.multiAdd(multi_, handle) != CURLM_OK) {
+    transfer.pool = nullptr;
     curl_.easyCleanup(handle);
     return CURLE_FAILED_INIT;
   }
@@ -115,6 +117,8 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
 void URLConnectionPool::remove(URLTransfer& transfer) {
   CURL* handle = std::exchange(transfer.handle, nullptr);
   curl_.multiRemove(multi_, handle);
+  transfer.leaveConnection();
+  transfer.pool = nullptr;
   if (idleHandles_.size() < kKeptHandles) {
     curl_.easySetOption(handle, CURLOPT_ERRORBUFFER, nullptr);
     curl_.easySetOption(handle, CURLOPT_HTTPHEADER, nullptr);
@@ -127,7 +131,7 @@ void URLConnectionPool::remove(URLTransfer& transfer) {
 }
 
 void URLConnectionPool::closeIfIdle() {
-  if (active_ != 0) return;
+  if (active_ != 0 || isRetired_) return;
   leaveIdle();
   const bool now = session_.invalidated.load();
   idle_.set(now ? network_.now() : network_.now() + network_.options().idleConnectionTime);
@@ -137,6 +141,49 @@ void URLConnectionPool::closeIfIdle() {
 void URLConnectionPool::leaveIdle() {
   idle_.cancel();
   network_.idlePools().remove(*this);
+}
+
+void URLConnectionPool::retire() {
+  leaveIdle();
+  isRetired_ = true;
+}
+
+void URLConnectionPool::opened(int socket, std::string interface) {
+  std::erase_if(connections_, [&](const auto& one) { return one->socket() == socket; });
+  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface)));
+}
+
+std::shared_ptr<URLConnection> URLConnectionPool::connectionBetween(const char* local, int localPort,
+                                                                    const char* peer, int peerPort) {
+  for (const auto& one : connections_)
+    if (one->isBetween(local, localPort, peer, peerPort)) return one;
+  return nullptr;
+}
+
+int URLConnectionPool::socketClosed(void* pool, curl_socket_t socket) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  for (const auto& one : self.connections_)
+    if (one->socket() == socket) one->closing();
+  std::erase_if(self.connections_, [&](const auto& one) { return one->socket() == socket; });
+  self.network_.sockets().closed(socket);
+  return close(socket);
+}
+
+bool URLConnectionPool::judgeConnections() {
+  bool good = true;
+  routesWhenJudged = network_.routeChanges();
+  for (const auto& one : connections_) {
+    if (!one->isConnected()) continue;
+    const RouteTable::Way way = one->way(network_.routes(), number_ == 1);
+    good = good && way == RouteTable::Way::same;
+    if (way != RouteTable::Way::none) {
+      one->lostSince.reset();
+    } else if (!one->lostSince) {
+      one->lostSince = network_.now();
+      for (URLTransfer* transfer : one->transfers) network_.connectionLost(*transfer);
+    }
+  }
+  return good;
 }
 
 int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {

@@ -6,11 +6,14 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
+#include <string>
 #include <vector>
 
 #include "platform/linux/url/CurlLibrary.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/LinkedList.h"
+#include "platform/linux/url/UrlConnection.h"
 
 namespace kyt {
 
@@ -28,6 +31,18 @@ class URLConnectionPool {
   [[nodiscard]] CURLcode add(URLTransfer& transfer);
   void remove(URLTransfer& transfer);  // whether it has ended or not
   void socketReady(int socket, uint32_t events);
+  // A socket for a connection of this pool; `interface`: that it is bound to.
+  void opened(int socket, std::string interface);
+  // The one between these addresses, or null.
+  [[nodiscard]] std::shared_ptr<URLConnection> connectionBetween(const char* local, int localPort,
+                                                                 const char* peer, int peerPort);
+  // Looks where its connections lead. Whether a new request may go on any of them: none would leave otherwise when
+  // it were made now.
+  [[nodiscard]] bool judgeConnections();
+  // No new request: it ends with its last one. Its owner is the network from then on.
+  void retire();
+  [[nodiscard]] bool isEmpty() const { return active_ == 0; }
+  uint64_t routesWhenJudged = 0;  // the number of their last change
   // Frees itself from the event loop, soon, when nothing is in it.
   void closeIfIdle();
   // Among the idle ones that are kept.
@@ -36,6 +51,7 @@ class URLConnectionPool {
 
  private:
   void leaveIdle();
+  static int socketClosed(void* pool, curl_socket_t socket);
   static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
   static int timerChanged(CURLM* multi, long milliseconds, void* pool);
   [[nodiscard]] CURL* takeHandle();
@@ -48,6 +64,8 @@ class URLConnectionPool {
   const CurlLibrary& curl_;
   CURLM* multi_;
   size_t active_ = 0;
+  bool isRetired_ = false;
+  std::vector<std::shared_ptr<URLConnection>> connections_;  // some of them never come to be
   std::vector<CURL*> idleHandles_;
   Deadline timer_;  // libcurl's
   Deadline idle_;

@@ -51,7 +51,13 @@ URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counte
       certificates_(options_.certificateFile),
       lines_(options_.maxActiveRequests, options_.maxActiveRequestsToOneServer),
       settle_(
-          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->retryWaiting(false); }, this),
+          deadlines_,
+          [](void* owner) {
+            auto* network = static_cast<URLNetwork*>(owner);
+            network->judgeConnections();
+            network->retryWaiting(false);
+          },
+          this),
       slowRetry_(
           deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->waitingTimer(); }, this) {}
 
@@ -182,6 +188,7 @@ void URLNetwork::run() {
     deadlines_.fireUntil(now_);
     cancelWhatIsUnwanted();
     activateNextInLine();
+    endRetiredPools();
     if (cancelled_.load()) {
       MutexLock lock(mutex_);
       if (stopping_ && commands_.empty()) break;
@@ -192,6 +199,7 @@ void URLNetwork::run() {
     sockets_.beginTurn();
     for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);
   }
+  endRetiredPools();
   while (!sessions_.empty()) {
     const std::shared_ptr<URLSessionState> session = sessions_.first()->self;
     closePool(*session, 0);
@@ -287,21 +295,35 @@ void URLNetwork::activate(URLTransfer& transfer) {
     transfer.phase = URLTransfer::Phase::inLine;
     return;
   }
-  std::unique_ptr<URLConnectionPool>& pool =
-      transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1];
-  if (!pool)
-    pool = std::make_unique<URLConnectionPool>(*this, *transfer.session, &pool - transfer.session->pools);
+  URLConnectionPool& pool = poolFor(transfer);
   transfer.clearReply();
   transfer.lastProgress = now_;
-  const CURLcode code = pool->add(transfer);
+  transfer.lostLook = MonotonicTime::max();
+  transfer.routesWhenActivated = routeChanges_;
+  const CURLcode code = pool.add(transfer);
   if (code != CURLE_OK) {
     lines_.hasGone(transfer);
-    pool->closeIfIdle();
+    pool.closeIfIdle();
     fail(transfer, code, curl_->easyErrorText(code));
     return;
   }
   transfer.phase = URLTransfer::Phase::active;
   armDeadline(transfer);
+}
+
+// The session's connections, or new ones when those would not lead to the server any more. Looking for events costs a
+// system call; that they were not handled yet must not send the request nowhere.
+URLConnectionPool& URLNetwork::poolFor(URLTransfer& transfer) {
+  URLSessionState& session = *transfer.session;
+  std::unique_ptr<URLConnectionPool>& pool = session.pools[transfer.request.allowsCellularAccess ? 0 : 1];
+  if (routeEvents_.takeAll()) noteRouteChanges();
+  if (pool && pool->routesWhenJudged != routeChanges_ && !pool->judgeConnections()) retire(pool);
+  if (!pool) {
+    pool = std::make_unique<URLConnectionPool>(*this, session, &pool - session.pools);
+    pool->routesWhenJudged = routeChanges_;
+    listenForRoutes();
+  }
+  return *pool;
 }
 
 void URLNetwork::activateNextInLine() {
@@ -311,6 +333,7 @@ void URLNetwork::activateNextInLine() {
 void URLNetwork::armDeadline(URLTransfer& transfer) {
   const bool active = transfer.phase == URLTransfer::Phase::active;
   MonotonicTime soonest = active ? transfer.lastProgress + options_.noProgressTimeout : MonotonicTime::max();
+  if (active) soonest = std::min(soonest, transfer.lostLook);
   if (transfer.request.timeout) soonest = std::min(soonest, transfer.started + *transfer.request.timeout);
   if (soonest == MonotonicTime::max()) {
     transfer.deadline.cancel();
@@ -320,21 +343,34 @@ void URLNetwork::armDeadline(URLTransfer& transfer) {
 }
 
 void URLNetwork::transferDeadline(URLTransfer& transfer) {
-  const bool late = transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout;
-  const bool stuck = transfer.phase == URLTransfer::Phase::active &&
-                     now_ >= transfer.lastProgress + options_.noProgressTimeout;
-  if (late || stuck) {
-    fail(transfer, CURLE_OPERATION_TIMEDOUT, late ? "The request timed out" : "The request made no progress");
+  const bool active = transfer.phase == URLTransfer::Phase::active;
+  if (transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout) {
+    if (active) retirePoolOf(transfer);
+    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request timed out");
+  } else if (active && now_ >= transfer.lastProgress + options_.noProgressTimeout) {
+    stuck(transfer);
+  } else if (active && now_ >= transfer.lostLook) {
+    lookAtLostConnection(transfer);
   } else {
     armDeadline(transfer);
   }
 }
 
 void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
-  long status = 0, systemError = 0;
+  long status = 0, systemError = 0, version = 0;
   curl_->easyGetInfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
   curl_->easyGetInfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
-  if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
+  curl_->easyGetInfo(transfer.handle, CURLINFO_HTTP_VERSION, &version);
+  const std::shared_ptr<URLConnection> connection = transfer.connection;
+  if (connection && version == CURL_HTTP_VERSION_1_1) connection->isSilent = true;
+  if (transfer.foundEndedConnection) {
+    if (!connection->transfers.empty()) retirePoolOf(transfer);  // others may still read from it
+    withdraw(transfer);
+    if (connection->transfers.empty()) connection->letGo();
+    activate(transfer);
+    return;
+  }
+  const bool unheard = code != CURLE_OK && transfer.hasBegun && transfer.isUnheard();
   withdraw(transfer);
   if (code == CURLE_OK) {
     transfer.takeReply(static_cast<int>(status));
@@ -342,9 +378,18 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
     finish(transfer);
     return;
   }
-  if (retryOrWait(transfer, code, systemError)) return;
+  if (unheard) connection->abortWhatIsLeft();
+  if (unheard ? goAgainOrWait(transfer) : !transfer.hasBegun && retryOrWait(transfer, code, systemError))
+    return;
+  letReplyFail(transfer, code);
+}
+
+void URLNetwork::letReplyFail(URLTransfer& transfer, CURLcode code) {
+  if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
   if (transfer.onlyCellularRoutes) {
     fail(transfer, code, "The request may not use cellular interfaces, and no other leads to the server");
+  } else if (transfer.wasToBeRepeated) {
+    fail(transfer, CURLE_GOT_NOTHING, "The connection ended without an answer");
   } else {
     fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_->easyErrorText(code));
   }
@@ -352,8 +397,7 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
 
 void URLNetwork::withdraw(URLTransfer& transfer) {
   if (transfer.phase == URLTransfer::Phase::active) lines_.hasGone(transfer);
-  if (transfer.handle != nullptr)
-    transfer.session->pools[transfer.request.allowsCellularAccess ? 0 : 1]->remove(transfer);
+  if (transfer.handle != nullptr) transfer.pool->remove(transfer);
   if (transfer.phase == URLTransfer::Phase::waiting) stopWaiting(transfer);
   transfer.deadline.cancel();
   transfer.phase = URLTransfer::Phase::submitted;
@@ -410,11 +454,6 @@ void URLNetwork::unlistIfUnused(URLSessionState& session) {
   if (!session.self || !session.transfers.empty() || session.pools[0] || session.pools[1]) return;
   sessions_.remove(session);
   const std::shared_ptr<URLSessionState> last = std::move(session.self);
-}
-
-int URLNetwork::socketClosed(void* network, curl_socket_t socket) {
-  static_cast<URLNetwork*>(network)->sockets_.closed(socket);
-  return close(socket);
 }
 
 }  // namespace kyt

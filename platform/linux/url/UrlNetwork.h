@@ -84,7 +84,9 @@ class URLNetwork {
   [[nodiscard]] CertificateStore& certificates() { return certificates_; }
   [[nodiscard]] const CurlURLSessionOptions& options() const { return options_; }
   [[nodiscard]] WatchedSockets& sockets() { return sockets_; }
-  static int socketClosed(void* network, curl_socket_t socket);
+  // How often routes and addresses have changed, as far as it is known.
+  [[nodiscard]] uint64_t routeChanges() const { return routeChanges_; }
+  void connectionLost(URLTransfer& transfer);  // no way leads from its connection to the server
   void transferEnded(URLTransfer& transfer, CURLcode code);
   void transferDeadline(URLTransfer& transfer);
   void closePool(URLSessionState& session, size_t number);
@@ -116,8 +118,20 @@ class URLNetwork {
   void finish(URLTransfer& transfer);    // its result is set
   void fail(URLTransfer& transfer, int32_t code, std::string description);
   void unlistIfUnused(URLSessionState& session);
+  [[nodiscard]] URLConnectionPool& poolFor(URLTransfer& transfer);
+  void letReplyFail(URLTransfer& transfer, CURLcode code);
   void cancelWhatIsUnwanted();
   void cancelRequests(Which which);
+
+  // Connections that are dead or lead nowhere, and what was on them (UrlNetworkConnections.cpp).
+  [[nodiscard]] bool goAgainOrWait(URLTransfer& transfer);
+  void stuck(URLTransfer& transfer);
+  void lookAtLostConnection(URLTransfer& transfer);
+  void noteRouteChanges();
+  void judgeConnections();
+  void retire(std::unique_ptr<URLConnectionPool>& pool);
+  void retirePoolOf(const URLTransfer& transfer);
+  void endRetiredPools();
 
   // Waiting for connectivity (UrlNetworkWaiting.cpp).
   class Answers;
@@ -156,6 +170,7 @@ class URLNetwork {
   IdlePools idlePools_;
   RouteTable routes_;
   RouteEvents routeEvents_;
+  uint64_t routeChanges_ = 0;
   CertificateStore certificates_;
   std::optional<CurlLibrary> curl_;
   std::string curlProblem_;  // the last one that was logged
@@ -164,6 +179,7 @@ class URLNetwork {
   bool awaitedGone_ = false;  // those there were when they were cancelled; later ones are refused
   RequestLines lines_;
   LinkedList<URLSessionState> sessions_;  // that have requests or connections
+  std::vector<std::unique_ptr<URLConnectionPool>> retired_;
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
   Deadline slowRetry_;
 

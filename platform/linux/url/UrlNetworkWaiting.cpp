@@ -19,6 +19,21 @@ constexpr uint8_t kImmediateRetries = 3;
 // What a waiting request counts at least: the request itself costs memory too, however small its body.
 constexpr size_t kLeastCharge = 1024;
 
+// Of an attempt of which not a byte was sent.
+bool mayComeOfBeingOffline(CURLcode code) {
+  switch (code) {
+    case CURLE_COULDNT_CONNECT:
+    case CURLE_COULDNT_RESOLVE_HOST:
+    case CURLE_OPERATION_TIMEDOUT:
+    case CURLE_SSL_CONNECT_ERROR:
+    case CURLE_SEND_ERROR:
+    case CURLE_RECV_ERROR:
+      return true;
+    default:
+      return false;
+  }
+}
+
 bool saysNoRoute(long systemError) {
   return systemError == ENETUNREACH || systemError == EHOSTUNREACH || systemError == ENETDOWN;
 }
@@ -27,14 +42,16 @@ bool saysNoRoute(long systemError) {
 
 bool URLNetwork::retryOrWait(URLTransfer& transfer, CURLcode code, long systemError) {
   if (!transfer.session->configuration.waitsForConnectivity) return false;
-  if (code != CURLE_COULDNT_CONNECT && code != CURLE_COULDNT_RESOLVE_HOST) return false;
+  if (!mayComeOfBeingOffline(code)) return false;
   if (code == CURLE_COULDNT_RESOLVE_HOST) transfer.addresses.clear();
   if (!canLeave(transfer)) {
     setAside(transfer);
     return true;
   }
-  const bool wasOffline =
-      code == CURLE_COULDNT_RESOLVE_HOST ? transfer.immediateRetries == 0 : saysNoRoute(systemError);
+  bool wasOffline = saysNoRoute(systemError);
+  if (code == CURLE_COULDNT_RESOLVE_HOST) wasOffline = transfer.immediateRetries == 0;
+  // What had been tried from an address that is no more, or over another way, says nothing of now.
+  if (transfer.routesWhenActivated != routeChanges_ && systemError != ECONNREFUSED) wasOffline = true;
   if (!wasOffline || transfer.immediateRetries >= kImmediateRetries) return false;
   ++transfer.immediateRetries;
   activate(transfer);
@@ -62,8 +79,8 @@ void URLNetwork::setAside(URLTransfer& transfer) {
   const std::shared_ptr<URLSessionState> kept = transfer.session;  // displacing may end its last request
   const bool listening = routeEvents_.descriptor() >= 0;
   while (session.waitingBytes > Limits::maxWaitingBytes) displaceOldest(session);
-  if (listening) return;
   listenForRoutes();
+  if (listening) return;
   // What changed before the subscription was not announced.
   if (!settle_.isSet()) settle_.set(now_ + kSettleTime);
 }
@@ -90,20 +107,15 @@ void URLNetwork::stopWaiting(URLTransfer& transfer) {
 
 void URLNetwork::listenForRoutes() {
   if (!slowRetry_.isSet()) slowRetry_.set(now_ + options_.waitingRetryPeriod);
-  if (!routeEvents_.subscribe()) return;
+  if (routeEvents_.descriptor() >= 0 || !routeEvents_.subscribe()) return;
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.u64 = kRoutes;
   epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event);
 }
 
-void URLNetwork::routesChanged() {
-  routeEvents_.takeAll();
-  if (!settle_.isSet()) settle_.set(now_ + kSettleTime);
-}
-
 void URLNetwork::waitingTimer() {
-  if (waiting_.load(std::memory_order_relaxed) == 0) {
+  if (waiting_.load(std::memory_order_relaxed) == 0 && sessions_.empty()) {
     routeEvents_.unsubscribe();
     return;
   }

@@ -16,7 +16,8 @@ namespace kyt {
 namespace {
 
 constexpr size_t kMaxReplyHeaderBytes = 256u << 10;
-constexpr size_t kMaxAddresses = 16;  // of one server that are remembered
+constexpr size_t kMaxAddresses = 16;          // of one server that are remembered
+constexpr uint8_t kMaxEndedConnections = 32;  // a session keeps eight to a server
 
 bool isControl(char c) {
   return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
@@ -97,6 +98,17 @@ void URLTransfer::clearReply() {
   errorText[0] = 0;
   addresses.clear();
   onlyCellularRoutes = replyTooLong = false;
+  hasBegun = wasToBeRepeated = foundEndedConnection = false;
+  leaveConnection();
+  connection.reset();
+}
+
+bool URLTransfer::isUnheard() {
+  return connection != nullptr && connection->hasAcknowledgedNothingBehind(mark);
+}
+
+void URLTransfer::leaveConnection() {
+  if (connection) std::erase(connection->transfers, this);
 }
 
 void URLTransfer::configure(CURL* easy) {
@@ -112,6 +124,11 @@ void URLTransfer::configure(CURL* easy) {
   curl.easySetOption(easy, CURLOPT_WRITEDATA, this);
   curl.easySetOption(easy, CURLOPT_XFERINFOFUNCTION, noteProgress);
   curl.easySetOption(easy, CURLOPT_XFERINFODATA, this);
+  // A burst shares one HTTP/2 connection. Over plain HTTP there is none to wait for, and waiting would not end before
+  // the first answer.
+  curl.easySetOption(easy, CURLOPT_PIPEWAIT, strncasecmp(request.url.c_str(), "https", 5) == 0 ? 1L : 0L);
+  curl.easySetOption(easy, CURLOPT_PREREQFUNCTION, beginOn);
+  curl.easySetOption(easy, CURLOPT_PREREQDATA, this);
   curl.easySetOption(easy, CURLOPT_OPENSOCKETFUNCTION, openSocket);
   curl.easySetOption(easy, CURLOPT_OPENSOCKETDATA, this);
   curl.easySetOption(easy, CURLOPT_FOLLOWLOCATION, request.maxRedirects > 0 ? 1L : 0L);
@@ -212,9 +229,36 @@ int URLTransfer::noteProgress(void* transfer, curl_off_t, curl_off_t received, c
   return 0;
 }
 
+// Runs before each time that libcurl sends the request. It would do so again, up to five times, when a kept connection
+// ends without an answer, whatever the server has done with what it got: no setting forbids that.
+int URLTransfer::beginOn(void* transfer, char* peer, char* local, int peerPort, int localPort) {
+  auto& self = *static_cast<URLTransfer*>(transfer);
+  self.wasToBeRepeated = self.hasBegun && !self.mayBeRepeated();
+  if (self.wasToBeRepeated) return CURL_PREREQFUNC_ABORT;
+  self.leaveConnection();
+  self.connection = self.pool->connectionBetween(local, localPort, peer, peerPort);
+  if (URLConnection* const chosen = self.connection.get()) {
+    self.foundEndedConnection =
+        chosen->requests > 0 && chosen->hasEnded() && self.endedConnections < kMaxEndedConnections;
+    if (self.foundEndedConnection) {
+      ++self.endedConnections;
+      return CURL_PREREQFUNC_ABORT;
+    }
+    self.mark = chosen->mark();
+    ++chosen->requests;
+    chosen->transfers.push_back(&self);
+    if (self.addresses.empty()) self.addresses.push_back(chosen->peer());
+  }
+  self.hasBegun = true;
+  self.response_ = {};
+  return CURL_PREREQFUNC_OK;
+}
+
 curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockaddr* address) {
   auto& self = *static_cast<URLTransfer*>(transfer);
   URLNetwork& network = *self.session->network;
+  self.wasToBeRepeated = self.hasBegun && !self.mayBeRepeated();
+  if (self.wasToBeRepeated) return CURL_SOCKET_BAD;
   if (self.addresses.size() < kMaxAddresses && address->addrlen <= sizeof(sockaddr_storage))
     std::memcpy(&self.addresses.emplace_back(), &address->addr, address->addrlen);
 
@@ -237,6 +281,7 @@ curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockadd
     (void)setsockopt(opened, SOL_SOCKET, SO_BINDTODEVICE, interface.c_str(),
                      static_cast<socklen_t>(interface.size() + 1));
   network.sockets().opened(opened);
+  self.pool->opened(opened, std::move(interface));
   return opened;
 }
 

@@ -16,6 +16,7 @@
 #include "platform/UrlSession.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/LinkedList.h"
+#include "platform/linux/url/UrlConnection.h"
 
 namespace kyt {
 
@@ -36,8 +37,12 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
 
   // Sets what differs between requests; everything else was set when the handle was made.
   void configure(CURL* handle);
-  // Forgets what an earlier attempt received.
+  // Forgets an earlier attempt and what it received.
   void clearReply();
+  // Whether the peer's TCP is known to have acknowledged not a byte of it. Of one that has begun.
+  [[nodiscard]] bool isUnheard();
+  // It is on its way on no connection any more; what is known of the one it was on stays.
+  void leaveConnection();
   // Of the request's headers, once it has been configured.
   [[nodiscard]] size_t headerSize() const { return headerText_.size(); }
   void takeReply(int status);
@@ -49,14 +54,24 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   // Started too late, the session was invalidated; or while too much of it was outstanding.
   enum class Refusal : uint8_t { none, invalidated, tooMuch } refusal = Refusal::none;
   uint8_t immediateRetries = 0;
-  bool onlyCellularRoutes = false;    // why the last attempt opened no connection
-  bool replyTooLong = false;          // … or ended
-  Links<URLTransfer> links;           // among its session's
-  std::shared_ptr<URLTransfer> self;  // keeps it alive while the network thread has it
-  CURL* handle = nullptr;             // while active
-  size_t waitingCharge = 0;           // while waiting
-  size_t outstandingCharge = 0;       // until its result is set
+  uint8_t endedConnections = 0;     // that were chosen for it
+  bool onlyCellularRoutes = false;  // why the last attempt opened no connection
+  bool replyTooLong = false;        // … or ended
+  bool hasBegun = false;            // it was handed to a connection, which may have sent some of it
+  bool wasToBeRepeated = false;     // libcurl was about to send it again, and was not let
+  bool foundEndedConnection =
+      false;                 // the kept connection chosen for it was none any more, so it has not begun
+  Links<URLTransfer> links;  // among its session's
+  std::shared_ptr<URLTransfer> self;          // keeps it alive while the network thread has it
+  CURL* handle = nullptr;                     // while active
+  URLConnectionPool* pool = nullptr;          // while active
+  std::shared_ptr<URLConnection> connection;  // that it began on last
+  URLConnection::Mark mark;                   // before its first byte
+  size_t waitingCharge = 0;                   // while waiting
+  size_t outstandingCharge = 0;               // until its result is set
+  uint64_t routesWhenActivated = 0;           // the number of their last change
   MonotonicTime started, lastProgress;
+  MonotonicTime lostLook;  // when to look again at a connection that is lost
   Deadline deadline;
   std::vector<sockaddr_storage> addresses;  // that the last attempt tried to connect to
   char errorText[CURL_ERROR_SIZE] = {};
@@ -66,8 +81,11 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   void addHeader(std::string_view name, std::string_view value);
   static size_t receiveHeader(char* bytes, size_t size, size_t count, void* transfer);
   static size_t receiveBody(char* bytes, size_t size, size_t count, void* transfer);
+  static int beginOn(void* transfer, char* peer, char* local, int peerPort, int localPort);
   static int noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent);
   static curl_socket_t openSocket(void* transfer, curlsocktype, curl_sockaddr* address);
+
+  [[nodiscard]] bool mayBeRepeated() const { return request.method == "GET" || request.method == "HEAD"; }
 
   URLCompletion completion_;
   std::string headerText_;              // all header lines, each ended by a zero

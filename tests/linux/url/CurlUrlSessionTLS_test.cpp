@@ -1,16 +1,10 @@
 #include <curl/curl.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <csignal>
 #include <filesystem>
-#include <fstream>
 #include <set>
-#include <sstream>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/Http2Nginx.h"
 
 namespace kyt {
 namespace {
@@ -137,75 +131,9 @@ TEST_F(CurlURLSessionTLS, RefusesARedirectThatLeavesHTTPS) {
   EXPECT_EQ(plain.requestCount(), 0u);
 }
 
-// nginx as a child process that ends with this object. Its listening socket is made here and handed over, so
-// that no port is guessed. It answers for a second server of its own, through a socket in the folder, since a
-// proxy reads a request's body before it passes it on: nginx answers by itself before it has read the body,
-// which ends the stream under the client that still sends.
-class Nginx {
- public:
-  Nginx(const std::string& folder, const TestCertificate& certificate) {
-    std::ofstream(folder + "/server.pem") << certificate.certificatePEM << certificate.keyPEM;
-    const int listening = listenOnAFreePort();
-    const std::string file = folder + "/nginx.conf";
-    std::ofstream(file) << configuration(folder);
-    const std::string inherited = std::to_string(listening) + ";", errors = folder + "/error.log";
-    pid_ = fork();
-    if (pid_ == 0) {
-      setenv("NGINX", inherited.c_str(), 1);
-      execl("/usr/sbin/nginx", "nginx", "-c", file.c_str(), "-p", folder.c_str(), "-e", errors.c_str(),
-            nullptr);
-      _exit(127);
-    }
-    close(listening);
-  }
-  ~Nginx() {
-    kill(pid_, SIGTERM);
-    waitpid(pid_, nullptr, 0);
-  }
-  Nginx(const Nginx&) = delete;
-  Nginx& operator=(const Nginx&) = delete;
-
-  [[nodiscard]] std::string url() const { return "https://127.0.0.1:" + std::to_string(port_) + "/"; }
-
- private:
-  [[nodiscard]] std::string configuration(const std::string& folder) const {
-    // With a socket handed over nginx needs its master process; its worker would leave root otherwise.
-    std::ostringstream text;
-    text << (geteuid() == 0 ? "user root;\n" : "") << "daemon off;\nworker_processes 1;\npid " << folder
-         << "/pid;\nerror_log " << folder << "/error.log;\nevents {}\nhttp {\naccess_log off;\n";
-    for (const char* kind : {"client_body", "proxy", "fastcgi", "uwsgi", "scgi"})
-      text << kind << "_temp_path " << folder << "/" << kind << ";\n";
-    text
-        << "server {\nlisten 127.0.0.1:" << port_ << " ssl http2;\nssl_certificate " << folder
-        << "/server.pem;\nssl_certificate_key " << folder
-        << "/server.pem;\nlocation / {\nproxy_pass http://unix:" << folder
-        << "/socket;\nproxy_pass_request_body off;\nproxy_set_header Content-Length \"\";\n"
-           "proxy_set_header X-Protocol $server_protocol;\nproxy_set_header X-Connection $connection;\n}\n}\n"
-           "server {\nlisten unix:"
-        << folder
-        << "/socket;\nlocation / { add_header Last-Modified then always; "
-           "return 200 \"$http_x_protocol $http_x_connection $http_x_kyt_source_application\"; }\n}\n}\n";
-    return text.str();
-  }
-  int listenOnAFreePort() {
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof address;
-    const int made = socket(AF_INET, SOCK_STREAM, 0);
-    EXPECT_EQ(bind(made, reinterpret_cast<sockaddr*>(&address), size), 0);
-    EXPECT_EQ(listen(made, 64), 0);
-    EXPECT_EQ(getsockname(made, reinterpret_cast<sockaddr*>(&address), &size), 0);
-    port_ = ntohs(address.sin_port);
-    return made;
-  }
-  uint16_t port_ = 0;
-  pid_t pid_ = -1;
-};
-
 TEST_F(CurlURLSessionTLS, SpeaksHTTP2WithARealServerAndSharesOneConnectionInABurst) {
-  if (access("/usr/sbin/nginx", X_OK) != 0) GTEST_SKIP() << "nginx is not installed";
-  const Nginx nginx(authority_.folder(), authority_.issue());
+  if (!HTTP2Nginx::isHere()) GTEST_SKIP() << "nginx is not installed";
+  const HTTP2Nginx nginx(authority_.folder(), authority_.issue());
   auto urls = session();
   std::vector<Outcome> outcomes(30);
   for (Outcome& outcome : outcomes)
