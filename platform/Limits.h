@@ -26,6 +26,10 @@ struct Limits {
   static constexpr int maxObjectDepth = 32;  // property lists and JSON: recursion
   static constexpr int maxIPCDepth = 64;     // the wire protocol's own: 32 arrays + 32 structs, and variants
   static constexpr size_t maxHTTPReplyBytes = 4u << 20;  // a server cannot fill the memory
+  // An HTTP request on its way, progress or not: so many seconds, and one more for each so many bytes of its body. A
+  // server that takes or gives a byte now and then cannot hold the thread that waits for it; the slowest links carry more.
+  static constexpr double requestSeconds = 300;
+  static constexpr size_t leastBodyBytesPerSecond = 2048;
   static constexpr size_t maxPropertyListTags = 131072;  // each takes up to 128 bytes while it is read
   static constexpr size_t maxWaitingBytes =
       16u << 20;  // request bodies waiting for connectivity, each URL session

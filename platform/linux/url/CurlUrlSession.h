@@ -36,8 +36,10 @@ struct CurlURLSessionOptions {
   std::string certificateFile;                              // PEM; empty: the system's
   std::vector<std::string> cellularInterfaces = {"wwan*"};  // shell patterns, besides what the kernel marks
   Duration noProgressTimeout = std::chrono::seconds(60);
-  Duration idleConnectionTime = std::chrono::seconds(30);  // then a session's connections close
-  size_t maxIdlePools = 512;                               // sessions with idle connections: descriptors
+  Duration requestTime = std::chrono::duration_cast<Duration>(
+      std::chrono::duration<double>(Limits::requestSeconds));  // and what its body takes
+  Duration idleConnectionTime = std::chrono::seconds(30);      // then a session's connections close
+  size_t maxIdlePools = 512;                                   // sessions with idle connections: descriptors
   size_t maxActiveRequests = Limits::maxActiveRequests;
   size_t maxActiveRequestsToOneServer = Limits::maxActiveRequestsToOneServer;
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events

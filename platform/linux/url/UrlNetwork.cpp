@@ -298,6 +298,8 @@ void URLNetwork::activate(URLTransfer& transfer) {
   URLConnectionPool& pool = poolFor(transfer);
   transfer.clearReply();
   transfer.lastProgress = now_;
+  transfer.latestEnd = now_ + options_.requestTime +
+                       std::chrono::seconds(transfer.request.body.size() / Limits::leastBodyBytesPerSecond);
   transfer.lostLook = MonotonicTime::max();
   transfer.routesWhenActivated = routeChanges_;
   const CURLcode code = pool.add(transfer);
@@ -333,7 +335,7 @@ void URLNetwork::activateNextInLine() {
 void URLNetwork::armDeadline(URLTransfer& transfer) {
   const bool active = transfer.phase == URLTransfer::Phase::active;
   MonotonicTime soonest = active ? transfer.lastProgress + options_.noProgressTimeout : MonotonicTime::max();
-  if (active) soonest = std::min(soonest, transfer.lostLook);
+  if (active) soonest = std::min({soonest, transfer.lostLook, transfer.latestEnd});
   if (transfer.request.timeout) soonest = std::min(soonest, transfer.started + *transfer.request.timeout);
   if (soonest == MonotonicTime::max()) {
     transfer.deadline.cancel();
@@ -347,6 +349,9 @@ void URLNetwork::transferDeadline(URLTransfer& transfer) {
   if (transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout) {
     if (active) retirePoolOf(transfer);
     fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request timed out");
+  } else if (active && now_ >= transfer.latestEnd) {
+    retirePoolOf(transfer);
+    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request took too long");
   } else if (active && now_ >= transfer.lastProgress + options_.noProgressTimeout) {
     stuck(transfer);
   } else if (active && now_ >= transfer.lostLook) {

@@ -71,7 +71,8 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   size_t outstandingCharge = 0;               // until its result is set
   uint64_t routesWhenActivated = 0;           // the number of their last change
   MonotonicTime started, lastProgress;
-  MonotonicTime lostLook;  // when to look again at a connection that is lost
+  MonotonicTime latestEnd;  // of this attempt
+  MonotonicTime lostLook;   // when to look again at a connection that is lost
   Deadline deadline;
   std::vector<sockaddr_storage> addresses;  // that the last attempt tried to connect to
   char errorText[CURL_ERROR_SIZE] = {};

@@ -482,6 +482,28 @@ TEST_F(CurlURLSession, WaitsForASlowReplyThatMakesProgress) {
   EXPECT_GT(std::chrono::steady_clock::now() - before, options_.noProgressTimeout);
 }
 
+TEST_F(CurlURLSession, EndsARequestThatAServerDripsAtForTooLong) {
+  options_.requestTime = 400ms;
+  server_.setReply({.body = std::string(1000, 'x'), .behaviour = Behaviour::drip, .interval = 20ms});
+  auto urls = session(true);
+  const auto before = std::chrono::steady_clock::now();
+  URLRequest request = post(server_.url("/"), "upload");
+  request.isAwaited = true;
+  const Outcome outcome = perform(*urls, std::move(request));
+  EXPECT_EQ(outcome.errorCode(), CURLE_OPERATION_TIMEDOUT);
+  EXPECT_EQ(outcome.errorText(), "The request took too long");
+  EXPECT_GE(std::chrono::steady_clock::now() - before, 400ms);
+  EXPECT_EQ(server_.requestCount(), 1u);
+}
+
+TEST_F(CurlURLSession, GivesALargeBodyMoreTime) {
+  options_.requestTime = 400ms;
+  server_.setReply({.body = std::string(40, 'x'), .behaviour = Behaviour::drip, .interval = 25ms});
+  auto urls = session(true);
+  const std::string body(60 * Limits::leastBodyBytesPerSecond, 'u');
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), body)).status(), 200);
+}
+
 TEST_F(CurlURLSession, EndsARequestAtItsTimeOutProgressOrNot) {
   server_.setReply({.body = std::string(1000, 'x'), .behaviour = Behaviour::drip, .interval = 20ms});
   auto urls = session();
