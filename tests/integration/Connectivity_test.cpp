@@ -129,6 +129,32 @@ TEST_F(Connectivity, EventsWaitWhileThereIsNoRouteAndArriveWhenItIsBack) {
   ASSERT_TRUE(route("add", "eth7"));
 }
 
+// The server knows nothing of it and keeps its connections.
+TEST_F(Connectivity, EventsWaitAlsoWhereAConnectionIsKeptAndArriveOnceFromAnotherAddress) {
+  ASSERT_TRUE(route("add", "eth7"));
+  serveBag(false);
+  startDaemon();
+  ASSERT_TRUE(there_->run("ip route add default via 10.77.0.2"));
+  TestClient client(daemon_->socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_->log();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", 0}}));
+  EXPECT_EQ(client.flush(), "flushed") << daemon_->log();
+  ASSERT_TRUE(route("del", "eth7"));
+  const long refused = refusedByTheKernel();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", 1}}));
+  const std::shared_future<std::string> answer = client.startFlush()->get_future().share();
+  ASSERT_TRUE(eventually([&] { return refusedByTheKernel() > refused; })) << "the daemon tried";
+  EXPECT_TRUE(isOpen(answer));
+  ASSERT_TRUE(here_->run("ip addr del 10.77.0.2/24 dev eth7 && ip addr add 10.77.0.3/24 dev eth7"));
+  ASSERT_TRUE(route("add", "eth7"));
+  ASSERT_EQ(answer.wait_for(kTestDeadline), std::future_status::ready);
+  EXPECT_EQ(answer.get(), "flushed") << daemon_->log();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", 2}}));
+  EXPECT_EQ(client.flush(), "flushed") << daemon_->log();
+  EXPECT_EQ(posts("plain"), 3U);
+  EXPECT_EQ(server_->requests().back().peer, "10.77.0.3");
+}
+
 TEST_F(Connectivity, EventsThatMayNotUseACellularInterfaceWaitForAnother) {
   ASSERT_TRUE(route("add", "wwan0"));
   ASSERT_TRUE(there_->run("ip route add default via 10.79.0.2"));

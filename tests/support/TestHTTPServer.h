@@ -48,7 +48,7 @@ class TestHTTPServer {
     close,        // closes without a byte
     reset,        // resets the connection without a byte
     drip,         // the body a byte at a time, `interval` apart
-    sayGoodbye,   // answers, ends its side of the connection, and goes on reading
+    sayGoodbye,   // answers, ends its side of the connection at the same time, and goes on reading
   };
 
   struct Reply {

@@ -6,6 +6,12 @@
 // kept alive for the session's next request. Completions run on a serial queue of each session, on worker
 // threads of their own ("kyt-url").
 //
+// A request is sent once: libcurl would send it again, up to five times, when a kept connection ends under it, and no
+// option forbids that. It goes again only where the server's TCP has acknowledged not a byte of it (UrlConnection.h), on
+// a new connection and three times at most; GET and HEAD, which change nothing, go again as libcurl likes. A kept
+// connection is looked at before it is used: whether its server has ended it, and, when the kernel has announced a
+// change of routes or addresses, whether a new one would leave the same way.
+//
 // In sessions that wait for connectivity a request without a route, or whose server's name cannot be looked
 // up because no name server has a route, is set aside until the kernel announces a change (or, as a second
 // net, a slow timer passes), and then tried again. Other failures, a refused connection for one, are the

@@ -173,7 +173,10 @@ bool URLConnectionPool::judgeConnections() {
   bool good = true;
   routesWhenJudged = network_.routeChanges();
   for (const auto& one : connections_) {
-    if (!one->isConnected()) continue;
+    if (!one->isConnected()) {  // nobody knows from where it is on its way
+      good = false;
+      continue;
+    }
     const RouteTable::Way way = one->way(network_.routes(), number_ == 1);
     good = good && way == RouteTable::Way::same;
     if (way != RouteTable::Way::none) {

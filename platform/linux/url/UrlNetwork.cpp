@@ -313,21 +313,6 @@ void URLNetwork::activate(URLTransfer& transfer) {
   armDeadline(transfer);
 }
 
-// The session's connections, or new ones when those would not lead to the server any more. Looking for events costs a
-// system call; that they were not handled yet must not send the request nowhere.
-URLConnectionPool& URLNetwork::poolFor(URLTransfer& transfer) {
-  URLSessionState& session = *transfer.session;
-  std::unique_ptr<URLConnectionPool>& pool = session.pools[transfer.request.allowsCellularAccess ? 0 : 1];
-  if (routeEvents_.takeAll()) noteRouteChanges();
-  if (pool && pool->routesWhenJudged != routeChanges_ && !pool->judgeConnections()) retire(pool);
-  if (!pool) {
-    pool = std::make_unique<URLConnectionPool>(*this, session, &pool - session.pools);
-    pool->routesWhenJudged = routeChanges_;
-    listenForRoutes();
-  }
-  return *pool;
-}
-
 void URLNetwork::activateNextInLine() {
   while (const std::shared_ptr<URLTransfer> next = lines_.next()) activate(*next);
 }
@@ -341,62 +326,6 @@ void URLNetwork::armDeadline(URLTransfer& transfer) {
     transfer.deadline.cancel();
   } else {
     transfer.deadline.set(soonest);
-  }
-}
-
-void URLNetwork::transferDeadline(URLTransfer& transfer) {
-  const bool active = transfer.phase == URLTransfer::Phase::active;
-  if (transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout) {
-    if (active) retirePoolOf(transfer);
-    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request timed out");
-  } else if (active && now_ >= transfer.latestEnd) {
-    retirePoolOf(transfer);
-    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request took too long");
-  } else if (active && now_ >= transfer.lastProgress + options_.noProgressTimeout) {
-    stuck(transfer);
-  } else if (active && now_ >= transfer.lostLook) {
-    lookAtLostConnection(transfer);
-  } else {
-    armDeadline(transfer);
-  }
-}
-
-void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
-  long status = 0, systemError = 0, version = 0;
-  curl_->easyGetInfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
-  curl_->easyGetInfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
-  curl_->easyGetInfo(transfer.handle, CURLINFO_HTTP_VERSION, &version);
-  const std::shared_ptr<URLConnection> connection = transfer.connection;
-  if (connection && version == CURL_HTTP_VERSION_1_1) connection->isSilent = true;
-  if (transfer.foundEndedConnection) {
-    if (!connection->transfers.empty()) retirePoolOf(transfer);  // others may still read from it
-    withdraw(transfer);
-    if (connection->transfers.empty()) connection->letGo();
-    activate(transfer);
-    return;
-  }
-  const bool unheard = code != CURLE_OK && transfer.hasBegun && transfer.isUnheard();
-  withdraw(transfer);
-  if (code == CURLE_OK) {
-    transfer.takeReply(static_cast<int>(status));
-    completed_.fetch_add(1, std::memory_order_relaxed);
-    finish(transfer);
-    return;
-  }
-  if (unheard) connection->abortWhatIsLeft();
-  if (unheard ? goAgainOrWait(transfer) : !transfer.hasBegun && retryOrWait(transfer, code, systemError))
-    return;
-  letReplyFail(transfer, code);
-}
-
-void URLNetwork::letReplyFail(URLTransfer& transfer, CURLcode code) {
-  if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
-  if (transfer.onlyCellularRoutes) {
-    fail(transfer, code, "The request may not use cellular interfaces, and no other leads to the server");
-  } else if (transfer.wasToBeRepeated) {
-    fail(transfer, CURLE_GOT_NOTHING, "The connection ended without an answer");
-  } else {
-    fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_->easyErrorText(code));
   }
 }
 

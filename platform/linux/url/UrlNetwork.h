@@ -118,12 +118,12 @@ class URLNetwork {
   void finish(URLTransfer& transfer);    // its result is set
   void fail(URLTransfer& transfer, int32_t code, std::string description);
   void unlistIfUnused(URLSessionState& session);
-  [[nodiscard]] URLConnectionPool& poolFor(URLTransfer& transfer);
-  void letReplyFail(URLTransfer& transfer, CURLcode code);
   void cancelWhatIsUnwanted();
   void cancelRequests(Which which);
 
-  // Connections that are dead or lead nowhere, and what was on them (UrlNetworkConnections.cpp).
+  // Connections, and how requests on them end (UrlNetworkConnections.cpp).
+  [[nodiscard]] URLConnectionPool& poolFor(URLTransfer& transfer);
+  void failWith(URLTransfer& transfer, CURLcode code);
   [[nodiscard]] bool goAgainOrWait(URLTransfer& transfer);
   void stuck(URLTransfer& transfer);
   void lookAtLostConnection(URLTransfer& transfer);

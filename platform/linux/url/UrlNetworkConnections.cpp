@@ -1,5 +1,6 @@
-// The network thread's connections that are dead or lead nowhere, and the requests that were on them. A request goes
-// again only where the server's TCP has acknowledged not a byte of it.
+// The network thread's connections: which a request begins on, how it ends, and what becomes of those that are dead or
+// lead nowhere and of the requests on them. A request goes again only where the server's TCP has acknowledged not a
+// byte of it.
 #include <algorithm>
 
 #include "platform/linux/url/UrlNetwork.h"
@@ -15,6 +16,77 @@ constexpr uint8_t kMostRepeats = 3;
 constexpr Duration kLostPatience = std::chrono::seconds(2);
 
 }  // namespace
+
+// The session's connections, or new ones when those would not lead to the server any more. Looking for events costs a
+// system call; that they were not handled yet must not send the request nowhere.
+URLConnectionPool& URLNetwork::poolFor(URLTransfer& transfer) {
+  URLSessionState& session = *transfer.session;
+  std::unique_ptr<URLConnectionPool>& pool = session.pools[transfer.request.allowsCellularAccess ? 0 : 1];
+  if (routeEvents_.takeAll()) noteRouteChanges();
+  if (pool && pool->routesWhenJudged != routeChanges_ && !pool->judgeConnections()) retire(pool);
+  if (!pool) {
+    pool = std::make_unique<URLConnectionPool>(*this, session, &pool - session.pools);
+    pool->routesWhenJudged = routeChanges_;
+    listenForRoutes();
+  }
+  return *pool;
+}
+
+void URLNetwork::transferDeadline(URLTransfer& transfer) {
+  const bool active = transfer.phase == URLTransfer::Phase::active;
+  if (transfer.request.timeout && now_ >= transfer.started + *transfer.request.timeout) {
+    if (active) retirePoolOf(transfer);
+    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request timed out");
+  } else if (active && now_ >= transfer.latestEnd) {
+    retirePoolOf(transfer);
+    fail(transfer, CURLE_OPERATION_TIMEDOUT, "The request took too long");
+  } else if (active && now_ >= transfer.lastProgress + options_.noProgressTimeout) {
+    stuck(transfer);
+  } else if (active && now_ >= transfer.lostLook) {
+    lookAtLostConnection(transfer);
+  } else {
+    armDeadline(transfer);
+  }
+}
+
+void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
+  long status = 0, systemError = 0, version = 0;
+  curl_->easyGetInfo(transfer.handle, CURLINFO_RESPONSE_CODE, &status);
+  curl_->easyGetInfo(transfer.handle, CURLINFO_OS_ERRNO, &systemError);
+  curl_->easyGetInfo(transfer.handle, CURLINFO_HTTP_VERSION, &version);
+  const std::shared_ptr<URLConnection> connection = transfer.connection;
+  if (connection && version == CURL_HTTP_VERSION_1_1) connection->isSilent = true;
+  if (transfer.foundEndedConnection) {
+    if (!connection->transfers.empty()) retirePoolOf(transfer);  // others may still read from it
+    withdraw(transfer);
+    if (connection->transfers.empty()) connection->letGo();
+    activate(transfer);
+    return;
+  }
+  const bool unheard = code != CURLE_OK && transfer.hasBegun && transfer.isUnheard();
+  withdraw(transfer);
+  if (code == CURLE_OK) {
+    transfer.takeReply(static_cast<int>(status));
+    completed_.fetch_add(1, std::memory_order_relaxed);
+    finish(transfer);
+    return;
+  }
+  if (unheard) connection->abortWhatIsLeft();
+  if (unheard ? goAgainOrWait(transfer) : !transfer.hasBegun && retryOrWait(transfer, code, systemError))
+    return;
+  failWith(transfer, code);
+}
+
+void URLNetwork::failWith(URLTransfer& transfer, CURLcode code) {
+  if (code == CURLE_WRITE_ERROR && transfer.replyTooLong) code = CURLE_FILESIZE_EXCEEDED;
+  if (transfer.onlyCellularRoutes) {
+    fail(transfer, code, "The request may not use cellular interfaces, and no other leads to the server");
+  } else if (transfer.wasToBeRepeated) {
+    fail(transfer, CURLE_GOT_NOTHING, "The connection ended without an answer");
+  } else {
+    fail(transfer, code, transfer.errorText[0] != 0 ? transfer.errorText : curl_->easyErrorText(code));
+  }
+}
 
 bool URLNetwork::goAgainOrWait(URLTransfer& transfer) {
   if (transfer.session->configuration.waitsForConnectivity && !canLeave(transfer)) {

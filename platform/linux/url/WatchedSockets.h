@@ -1,6 +1,6 @@
 // What the network thread's event loop knows about libcurl's sockets, by number: which pool each belongs to
 // and what the kernel watches it for. A connection that idles stays watched for input, which is what its next
-// request begins with, so that a request on a connection that exists costs no system call here. Network
+// request begins with, so that watching costs a request on a connection that exists no system call. Network
 // thread only.
 #pragma once
 

@@ -2,11 +2,28 @@
 // second time.
 #include <curl/curl.h>
 
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
 #include <map>
 #include <mutex>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 #include "tests/linux/url/Http2Nginx.h"
+
+namespace {
+std::atomic<int> sendsThatFail{0};  // of those that are to wait for nothing: libcurl's
+}
+
+// In place of the C library's, for libcurl too.
+extern "C" ssize_t send(int socket, const void* bytes, size_t size, int flags) {
+  const bool fails = sendsThatFail > 0 && sendsThatFail-- > 0;
+  if (!fails) return syscall(SYS_sendto, socket, bytes, size, flags, nullptr, 0);
+  errno = ENOBUFS;
+  return -1;
+}
 
 namespace kyt {
 namespace {
@@ -130,6 +147,31 @@ TEST_P(KeptConnections, AnUnansweredRequestDelaysNoOtherOfItsSession) {
   EXPECT_FALSE(slow.isDone());
   server_->release();
   EXPECT_TRUE(slow.wait());
+}
+
+class NewConnections : public CurlURLSessionFixture {
+ protected:
+  ~NewConnections() override { sendsThatFail = 0; }
+  TestHTTPServer server_;
+};
+
+TEST_F(NewConnections, AFailedSendIsMadeGoodOnAnotherOne) {
+  auto urls = session(true);
+  sendsThatFail = 1;
+  const Outcome outcome = perform(*urls, post(server_.url("/"), "x"));
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_EQ(sendsThatFail, 0);
+  EXPECT_EQ(server_.requestCount(), 1u);
+}
+
+TEST_F(NewConnections, WhereEverySendFailsThePostFailsSoonAndThoseAfterItAreNotDelayed) {
+  options_.noProgressTimeout = 10min;
+  auto urls = session(true);
+  sendsThatFail = 1000;
+  EXPECT_NE(perform(*urls, post(server_.url("/"), "one")).errorCode(), 0);
+  sendsThatFail = 0;
+  EXPECT_EQ(perform(*urls, post(server_.url("/"), "two")).status(), 200);
+  EXPECT_EQ(server_.requestCount(), 1u);
 }
 
 class KeptHTTP2Connections : public CurlURLSessionFixture {

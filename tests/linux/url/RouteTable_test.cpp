@@ -114,6 +114,25 @@ TEST_F(RouteTableTest, KnowsCellularInterfacesByPatternAndByTheKernelsMark) {
   EXPECT_TRUE(routes_->isCellular("eth7"));
 }
 
+TEST_F(RouteTableTest, KnowsWhetherAConnectionWouldLeaveAnotherWay) {
+  using Way = RouteTable::Way;
+  const auto way = [&](const char* local, const char* interface, bool avoidCellular) {
+    const sockaddr_storage from = address(local), to = address("10.78.0.1");
+    return routes_->wayOf(reinterpret_cast<const sockaddr&>(from), reinterpret_cast<const sockaddr&>(to),
+                          interface, avoidCellular);
+  };
+  EXPECT_EQ(way("10.77.0.2", "", false), Way::none);
+  ASSERT_TRUE(here_->run("ip route add 10.78.0.0/24 via 10.80.0.1 metric 600"));
+  EXPECT_EQ(way("10.80.0.2", "", false), Way::same);
+  EXPECT_EQ(way("10.77.0.2", "", false), Way::other);
+  EXPECT_EQ(way("10.77.0.2", "eth7", true), Way::none);
+  ASSERT_TRUE(here_->run("ip route add 10.78.0.0/24 via 10.77.0.1"));
+  EXPECT_EQ(way("10.80.0.2", "", false), Way::other);
+  EXPECT_EQ(way("10.77.0.2", "", false), Way::same);
+  EXPECT_EQ(way("10.77.0.2", "eth7", true), Way::same);
+  EXPECT_EQ(way("10.77.0.2", "eth9", true), Way::other);
+}
+
 TEST_F(RouteTableTest, CanResolveWhereANameServerHasARoute) {
   EXPECT_FALSE(routes_->canResolve());  // no file, no default route
   resolver("# nothing\nsearch example\nnameserver 10.99.0.1\nnameserver 10.77.0.1 # the second\n");
