@@ -17,6 +17,17 @@ Dictionary client(const std::string& name, const std::string& base) {
           {"realtime_post_url", base + "/events/" + name + "/realtime"}};
 }
 
+// For programs that people try out: what they send leaves at once, unless their session batches.
+Dictionary guest(const std::string& base) {
+  return {{"client", "example"},
+          {"service", "demo"},
+          {"locale_whitelist", Array{"DE", "FR"}},
+          {"filters", Array{}},
+          {"sampling_threshold", 1.0},
+          {"event_threshold", 49},
+          {"post_url", base + "/events/example"}};
+}
+
 std::string script(const std::string& name, int sessionID, int clientType) {
   const std::string user = "{\"ClientName\":\"" + name + "\",\"ServiceName\":\"demo\"}";
   std::string text =
@@ -42,8 +53,9 @@ std::string script(const std::string& name, int sessionID, int clientType) {
 }  // namespace
 
 Dictionary demoBag(const std::string& serverBase, const std::string& backend, const std::string& clientName) {
-  const Dictionary section = {{backend, Dictionary{{"display_url", serverBase + "/"},
-                                                   {"clients", Array{client(clientName, serverBase)}}}}};
+  const Dictionary section = {
+      {backend, Dictionary{{"display_url", serverBase + "/"},
+                           {"clients", Array{client(clientName, serverBase), guest(serverBase)}}}}};
   return {{"version", "demo-1"}, {"refresh_cycle", 3600}, {"release", section}, {"vantu_internal", section}};
 }
 

@@ -13,7 +13,8 @@ inline constexpr int kDemoEvents = 20;
 inline constexpr char kDemoDigestKeyHex[] = "6b79742d64656d6f2d646967657374";
 inline constexpr char kDemoAccount[] = "owner@example.org";
 
-// A storebag with one back end and one client: "kytdemo" reports through "qrs" (posts signed with the digest
+// A storebag with one back end and two clients, of which the second is "example" with the service "demo", for whoever
+// tries a program of his own: "kytdemo" reports through "qrs" (posts signed with the digest
 // key) as client type 20 ("cadmor"), "kytdemo-plain" through "httppost" as client type 8 ("dulvek").
 [[nodiscard]] Dictionary demoBag(const std::string& serverBase, const std::string& backend,
                                  const std::string& clientName);
