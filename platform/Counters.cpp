@@ -141,4 +141,18 @@ bool Counters::addAndMayLog(Reason reason, MonotonicTime now, uint64_t count) {
   return lastLogged.compare_exchange_strong(last, time, std::memory_order_relaxed);
 }
 
+bool Counters::mayTell(Reason reason, std::string_view subject, MonotonicTime now) {
+  const auto isOld = [now](const auto& entry) { return now - entry.second >= std::chrono::minutes(1); };
+  constexpr size_t kLongestSubject = 256;  // clients and servers choose its parts
+  const std::pair key(reason, std::string(subject.substr(0, kLongestSubject)));
+  MutexLock lock(toldMutex_);
+  if (const auto known = told_.find(key); known != told_.end()) {
+    if (!isOld(*known)) return false;
+    known->second = now;
+    return true;
+  }
+  if (told_.size() >= kMostSubjects) std::erase_if(told_, isOld);
+  return told_.size() < kMostSubjects && told_.emplace(key, now).second;
+}
+
 }  // namespace kyt

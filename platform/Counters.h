@@ -6,8 +6,13 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <map>
+#include <string>
+#include <string_view>
+#include <utility>
 
 #include "platform/Clock.h"
+#include "platform/Mutex.h"
 
 namespace kyt {
 
@@ -90,11 +95,18 @@ class Counters {
   }
   // add(), and whether a line about it may be written now (none was in the last minute).
   [[nodiscard]] bool addAndMayLog(Reason reason, MonotonicTime now, uint64_t count = 1);
+  // Whether a line about that reason and this subject (a client, an address) may be written now: none was in the last
+  // minute. For lines that tell a person why, which come once and not with each event. At most kMostSubjects are known
+  // at a time; one beyond them is not told. Takes a lock and copies the subject: not for the road of each event.
+  [[nodiscard]] bool mayTell(Reason reason, std::string_view subject, MonotonicTime now) EXCLUDES(toldMutex_);
 
  private:
+  static constexpr size_t kMostSubjects = 1024;
   static constexpr size_t kReasons = static_cast<size_t>(Reason::numberOfReasons);
   std::array<std::atomic<uint64_t>, kReasons> values_{};
   std::array<std::atomic<int64_t>, kReasons> lastLogged_{};  // monotonic nanoseconds, 0: never
+  Mutex toldMutex_;
+  std::map<std::pair<Reason, std::string>, MonotonicTime> told_ GUARDED_BY(toldMutex_);
 };
 
 }  // namespace kyt

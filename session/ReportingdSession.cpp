@@ -112,6 +112,7 @@ void ReportingdSession::startConfigWithCompletionHandler(StatesReply reply) {
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
   withoutBackends_ = storebag ? Reason::noBackEnds : Reason::noStorebag;
   if (!storebag) {
+    tellDrop(Reason::noStorebag, "there is no storebag for this client type");
     if (reply) reply(std::nullopt);
     return;
   }

@@ -15,6 +15,7 @@
 
 #include <array>
 #include <atomic>
+#include <bitset>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -124,6 +125,10 @@ class ReportingdSession final : public ClientSessionInterface,
   void internalSendMessage(std::optional<Dictionary> payload, const TimeValue& timestamp, uint16_t method,
                            uint16_t respCode);
   [[nodiscard]] Dictionary envelopeWithPayload(std::optional<Dictionary> payload);
+  // At the default level, once for a reason in the session's life, and once a minute for its user and client type.
+  void tellDrop(Reason reason, const std::string& why);
+  void tellFiltered(const KYTReportingBackend& backend, uint16_t category);
+  void tellOddNumbers(const Value& category, const Value& type);
   Value routeToBackends(Dictionary envelope, const TimeValue& timestamp, uint16_t category, uint16_t type,
                         MessageFlag flag);
 
@@ -161,6 +166,8 @@ class ReportingdSession final : public ClientSessionInterface,
   Dictionary _periodicServices;  // nothing here fills it
   std::optional<String> _storebagVersion;
   Reason withoutBackends_ = Reason::notConfigured;  // why a message finds no back end, when it finds none
+  std::bitset<static_cast<size_t>(Reason::numberOfReasons)> toldDrops_;
+  bool toldOddNumbers_ = false;
   bool _hasFinishedGracefully = false;
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()

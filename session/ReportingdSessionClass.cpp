@@ -37,6 +37,16 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::sing
 // Deliberately unlike the session's own door: each back end works out its state first, gets the bare payload
 // without an envelope or shared data, with the serial number on internal builds, and always the flag 0;
 // nothing is aggregated.
+void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, uint16_t category) const {
+  const std::string name = backend.name().str();
+  platform().counters.add(Reason::eventFiltered);
+  if (platform().counters.mayTell(Reason::eventFiltered, name + std::to_string(category),
+                                  platform().clock.monotonic()))
+    platform().log.normal(
+        "sendMessageWithSessionInfo: A message was dropped: the lists of the back end %s keep category %d away",
+        name.c_str(), category);
+}
+
 void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dictionary>& sessionInfo,
                                                         const std::optional<Dictionary>& userInfo,
                                                         const std::optional<Dictionary>& storebag,
@@ -73,14 +83,14 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
       log.debug(
           "sendMessageWithSessionInfo: Dropping event with category %d as it is not whitelisted for backend %s",
           category, backend->name().c_str());
-      platform().counters.add(Reason::eventFiltered);
+      tellFiltered(*backend, category);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
       log.debug(
           "sendMessageWithSessionInfo: Dropping event with category %d as it is blacklisted for backend %s",
           category, backend->name().c_str());
-      platform().counters.add(Reason::eventFiltered);
+      tellFiltered(*backend, category);
       continue;
     }
     Dictionary message = payload.value_or(Dictionary());

@@ -17,6 +17,7 @@
 namespace kyt {
 
 class BackendFactory;
+class KYTReportingBackend;
 class MessageLog;
 class ReportingSessionConnectivityHelper;
 
@@ -44,6 +45,7 @@ class ReportingdSessionClass {
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> singleMessageHelper();
 
  private:
+  void tellFiltered(const KYTReportingBackend& backend, uint16_t category) const;
   Configuration configuration_;
   BackendFactory& backendFactory_;
   MessageLog& messageLog_;

@@ -17,24 +17,76 @@ void ReportingdSession::sendMessageWithDictionary(Dictionary message, ObjectRepl
   if (reply) reply(std::move(answer));
 }
 
+namespace {
+
+constexpr int64_t kLast16 = 65535;
+
+std::string whyWithoutBackends(Reason reason) {
+  if (reason == Reason::notConfigured) return "it was not configured (StartConfigWithCompletionHandler)";
+  return reason == Reason::noStorebag ? "there is no storebag for this client type"
+                                      : "the storebag names no back end for it";
+}
+
+// What a number's low 16 bits say differs from what was sent.
+bool isOdd(const Value& value) {
+  if (const auto number = value.integer()) return *number < 0 || *number > kLast16;
+  const auto number = value.unsignedInteger();
+  return !number || *number > kLast16;
+}
+
+int32_t clientTypeIn(const std::optional<Dictionary>& sessionInfo) {
+  const Value* type = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoClientType) : nullptr;
+  return type != nullptr ? type->intValue() : 0;
+}
+
+}  // namespace
+
+void ReportingdSession::tellDrop(Reason reason, const std::string& why) {
+  const auto bit = static_cast<size_t>(reason);
+  if (toldDrops_.test(bit)) return;
+  toldDrops_.set(bit);
+  const int32_t clientType = clientTypeIn(_sessionInfo);
+  const std::string subject = std::to_string(peerUser_) + ":" + std::to_string(clientType) + ":" + why;
+  if (!counters().mayTell(reason, subject, platform().clock.monotonic())) return;
+  log().normal("sendMessageWithDictionary: Messages of session %u, client type %d, are dropped: %s",
+               _sessionID, clientType, why.c_str());
+}
+
+// They are taken all the same: the daemon reads leniently.
+void ReportingdSession::tellOddNumbers(const Value& category, const Value& type) {
+  toldOddNumbers_ = true;
+  const int32_t clientType = clientTypeIn(_sessionInfo);
+  const std::string subject = "odd:" + std::to_string(peerUser_) + ":" + std::to_string(clientType);
+  if (!counters().mayTell(Reason::categoryOrTypeMissing, subject, platform().clock.monotonic())) return;
+  log().normal(
+      "sendMessageWithDictionary: Session %u, client type %d, sends a Category or Type that is no number up to 65535: "
+      "%s and %s are read as %u and %u",
+      _sessionID, clientType, kyt::description(category).c_str(), kyt::description(type).c_str(),
+      category.unsignedIntValue() & 0xffffU, type.unsignedIntValue() & 0xffffU);
+}
+
 Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!hasBackends()) {
     log().debug("sendMessageWithDictionary: No backends available to send message");
     counters().add(withoutBackends_);
+    tellDrop(withoutBackends_, whyWithoutBackends(withoutBackends_));
     return nullptr;
   }
   const Value* category = message.find(kKYTReportingMessageParametersCategory);
   if (category == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
     counters().add(Reason::categoryOrTypeMissing);
+    tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
   const Value* type = message.find(kKYTReportingMessageParametersType);
   if (type == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
     counters().add(Reason::categoryOrTypeMissing);
+    tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
+  if (!toldOddNumbers_ && (isOdd(*category) || isOdd(*type))) tellOddNumbers(*category, *type);
   const auto method = static_cast<uint16_t>(category->unsignedIntValue());
   const auto respCode = static_cast<uint16_t>(type->unsignedIntValue());
   const Value* flag = message.find(kKYTReportingMessageParametersFlag);
@@ -63,6 +115,13 @@ Dictionary ReportingdSession::envelopeWithPayload(std::optional<Dictionary> payl
   return envelope;
 }
 
+// Not for a session's own start and stop messages, which are events of category 0.
+void ReportingdSession::tellFiltered(const KYTReportingBackend& backend, uint16_t category) {
+  if (category == 0 || toldDrops_.test(static_cast<size_t>(Reason::eventFiltered))) return;
+  tellDrop(Reason::eventFiltered, "the lists of the back end " + backend.name().str() + " keep category " +
+                                      std::to_string(category) + " away");
+}
+
 Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& timestamp, uint16_t category,
                                          uint16_t type, MessageFlag flag) {
   Value answer;
@@ -74,6 +133,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
           "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
           category, backend->name().c_str());
       counters().add(Reason::eventFiltered);
+      tellFiltered(*backend, category);
       continue;
     }
     if (backend->isBlacklistedEvent(category)) {
@@ -81,6 +141,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
           "sendMessageWithDictionary: Dropping event with category %d as it is blacklisted for backend %s",
           category, backend->name().c_str());
       counters().add(Reason::eventFiltered);
+      tellFiltered(*backend, category);
       continue;
     }
     Value result = backend->sendMessage(left == 0 ? std::exchange(envelope, {}) : envelope, timestamp,
@@ -123,6 +184,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
   if (!storebag) {
     counters().add(Reason::noStorebag);
+    tellDrop(Reason::noStorebag, whyWithoutBackends(Reason::noStorebag));
     if (reply) reply("storebag not available");
     return;
   }

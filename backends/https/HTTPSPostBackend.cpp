@@ -55,7 +55,13 @@ HTTPSPostBackend::HTTPSPostBackend(Configuration& configuration, String name, Di
 HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
-  if (batchedEvents_) platform_.counters.add(Reason::batchDiscarded, batchedEvents_->size());
+  if (!batchedEvents_) return;
+  platform_.counters.add(Reason::batchDiscarded, batchedEvents_->size());
+  tellDiscarded(batchedEvents_->size(),
+                requireUserInfo_ && !hasUserInfo() ? "user information was promised and is missing"
+                : state_ == kBackendStateEnabled
+                    ? "a single message was batched, since its client entry has \"expedite\" 0"
+                    : "the back end was not enabled");
 }
 
 void HTTPSPostBackend::readUserDefaults() {

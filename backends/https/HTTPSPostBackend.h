@@ -121,6 +121,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] bool passesRules(const Dictionary& entry, const String* country);
   [[nodiscard]] bool passesConsent(const Dictionary& entry);
   [[nodiscard]] bool passesLists(const Dictionary& entry, const String* country) const;
+  void tellDiscarded(size_t events, const char* why) const;
   [[nodiscard]] int32_t decideBySampling(const Dictionary& entry, const String* country);
   void tellWhyNot(Reason reason, const char* why) const;
   void takeSettings(const Dictionary& entry, const Client& client, int32_t state);

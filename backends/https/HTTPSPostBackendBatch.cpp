@@ -127,12 +127,22 @@ HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records,
   return enabled ? BatchTaking::taken : BatchTaking::discarded;
 }
 
+void HTTPSPostBackend::tellDiscarded(size_t events, const char* why) const {
+  if (!platform_.counters.mayTell(Reason::batchDiscarded, why + std::to_string(compType()),
+                                  platform_.clock.monotonic()))
+    return;
+  platform_.log.normal("HTTPSPostBackend(flushMessages): %s discards %zu events of client type %d: %s",
+                       name_.c_str(), events, compType(), why);
+}
+
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   Array batch;
   uint64_t bytes = 0;
   switch (stateQueue().sync([&] { return takeBatchOnQueue(batch, bytes); })) {
     case BatchTaking::discarded:
       platform_.counters.add(Reason::batchDiscarded, batch.size());
+      if (requireUserInfo_ && !hasUserInfo())
+        tellDiscarded(batch.size(), "user information was promised and is missing");
       [[fallthrough]];
     case BatchTaking::nothing:
       complete(completion, localError("Nothing to flush"));

@@ -68,7 +68,6 @@ struct Reply {
     platform.counters.add(request);
     platform.counters.add(lost, events);
   }
-
   // What switches the back end off has a line of its own.
   void tell(int status, Reason request, Reason lost) {
     platform.counters.add(request);
@@ -211,6 +210,11 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
   const std::optional<String>& url = isRealtime(flag) ? realtimePostURL_ : postURL_;
   if (!url) {
     platform_.counters.add(Reason::postWithoutURL, events);
+    if (platform_.counters.mayTell(Reason::postWithoutURL, name_.str() + std::to_string(compType()),
+                                   platform_.clock.monotonic()))
+      platform_.log.normal(
+          "HTTPSPostBackend(postJsonMessage): The storebag's %s has no post_url for client type %d: %zu events are lost",
+          name_.c_str(), compType(), events);
     if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
     return;
   }

@@ -380,6 +380,31 @@ TEST_F(DroppedMessages, CountForMissingNumbers) {
   EXPECT_EQ(count(Reason::categoryOrTypeMissing), 2U);
 }
 
+TEST_F(DroppedMessages, AreToldOnceForEachReasonAtTheDefaultLevel) {
+  test_.log.setLevel(LogLevel::normal);
+  const auto told = [this](const std::string& why) {
+    size_t lines = 0;
+    for (const auto& line : test_.sink.lines())
+      if (line.line.find(why) != std::string::npos) ++lines;
+    return lines;
+  };
+  for (int i = 0; i < 3; ++i) send(message(1, 2));
+  EXPECT_EQ(told("are dropped: it was not configured"), 1U);
+  configure({"httppost"});
+  for (int i = 0; i < 3; ++i) send(Dictionary{{"Category", 1}});
+  EXPECT_EQ(told("are dropped: they have no \"Category\" or no \"Type\""), 1U);
+}
+
+// They are taken all the same.
+TEST_F(DroppedMessages, NumbersThatAreCutOrNoneAreTold) {
+  configure({"httppost"});
+  send(Dictionary{{"Category", "three"}, {"Type", 70000}});
+  EXPECT_TRUE(
+      test_.sink.contains(LogLevel::normal,
+                          "sends a Category or Type that is no number up to 65535: three and 70000 are "
+                          "read as 0 and 4464"));
+}
+
 TEST_F(DroppedMessages, CountForEachBackEndWhoseListsRefuseThem) {
   configure({"httppost", "httppost2", "dashboard"});
   backend("httppost").setLists(numbers({5}), std::nullopt);
