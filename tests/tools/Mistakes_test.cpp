@@ -174,7 +174,7 @@ TEST_F(Mistakes, AServerThatRefusesIsToldByTheLog) {
   expectTold("/events answered with status 404, 1 events of backend httppost are lost");
   ASSERT_TRUE(stage_->control("/control/reply", R"({"path":"/events","status":503,"times":1})"));
   EXPECT_EQ(send().text, "finished\n");
-  expectTold("postJSONMessage: ");
+  expectTold("postJSONMessage: backend httppost disabled by server 503 return code");
   expectCounted("post-refused");
 }
 
