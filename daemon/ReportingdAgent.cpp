@@ -1,7 +1,6 @@
 // Connections and the list of live sessions.
 #include "daemon/ReportingdAgent.h"
 
-#include <algorithm>
 #include <chrono>
 #include <utility>
 
@@ -81,7 +80,10 @@ std::shared_ptr<ReportingdSession> ReportingdAgent::createReportingSessionWithDe
     transaction_.begin();
     transactionOpen_ = true;
   }
-  _sessionList.push_back(session);
+  const uint64_t place = nextPlace_++;
+  _sessionList.emplace(place, session);
+  places_.emplace(session.get(), place);
+  census_.set(place, session->clientType(), session->batchedEventsSize());
   sessionCount_.store(_sessionList.size(), std::memory_order_relaxed);
   return session;
 }
@@ -110,8 +112,12 @@ void ReportingdAgent::invalidateReportingSession(const std::shared_ptr<Reporting
     _correlatedSessions.erase(token->str());
     _sharedData.removeToken(*token);
   }
-  const auto listed = std::find(_sessionList.begin(), _sessionList.end(), session);
-  if (listed != _sessionList.end()) _sessionList.erase(listed);
+  const auto place = places_.find(session.get());
+  if (place != places_.end()) {
+    census_.remove(place->second);
+    _sessionList.erase(place->second);
+    places_.erase(place);
+  }
   sessionCount_.store(_sessionList.size(), std::memory_order_relaxed);
   if (_sessionList.empty() && transactionOpen_) {
     transactionOpen_ = false;
@@ -125,7 +131,7 @@ void ReportingdAgent::finishAllSessions() {
   {
     MonitorLock lock(monitor_);
     connections.reserve(_sessionList.size());
-    for (const auto& session : _sessionList) connections.push_back(session->connection());
+    for (const auto& [place, session] : _sessionList) connections.push_back(session->connection());
   }
   for (const auto& connection : connections)
     if (connection != nullptr) connection->finish();

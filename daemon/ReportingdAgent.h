@@ -24,6 +24,7 @@
 #include "config/Configuration.h"
 #include "daemon/HierarchyGroup.h"
 #include "daemon/RefusedClients.h"
+#include "daemon/SessionCensus.h"
 #include "daemon/SharedDataStore.h"
 #include "platform/Clock.h"
 #include "platform/Mutex.h"
@@ -56,7 +57,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
       ReportingdSessionDelegate& delegate, const std::shared_ptr<Connection>& connection);
   void invalidateReportingSession(const std::shared_ptr<ReportingdSession>& session);
 
-  // ReportingdSessionDelegate. All of these take the monitor themselves.
+  // ReportingdSessionDelegate. All of these take the monitor themselves where they need it.
   [[nodiscard]] std::string description() const override;
   [[nodiscard]] Monitor& monitor() override { return monitor_; }
   std::optional<Dictionary> storebagForSession(ReportingdSession& session) override;
@@ -69,6 +70,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   void updateSharedDataForSession(ReportingdSession& session, const Dictionary& sharedData) override;
   void removeObjectFromSharedDataForSession(ReportingdSession& session, const String& key) override;
   std::optional<Dictionary> sharedDataForSession(ReportingdSession& session) override;
+  void sessionFiguresMayHaveChanged(ReportingdSession& session) override;
   void addAgentHealthInfoForSession(ReportingdSession& session, Dictionary& payload) override;
 
   // Shut-down: refuses new connections and finishes those there are. Any thread, does not wait.
@@ -93,6 +95,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   [[nodiscard]] const HierarchyGroup* group(const std::optional<String>& token) const REQUIRES(monitor_);
   [[nodiscard]] bool isIn(const HierarchyGroup& group, const String& token,
                           const ReportingdSession& session) const REQUIRES(monitor_);
+  void refreshCensus() REQUIRES(monitor_);
   uint64_t addSessionHealthInfo(const ReportingdSession& session, HealthReport& healthReport)
       REQUIRES(monitor_);
   void fetchAndCacheStorebag(int32_t clientType) REQUIRES(monitor_);
@@ -107,7 +110,11 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   ProcessTransaction& transaction_;
 
   Monitor monitor_;
-  std::vector<std::shared_ptr<ReportingdSession>> _sessionList GUARDED_BY(monitor_);  // in creation order
+  std::map<uint64_t, std::shared_ptr<ReportingdSession>> _sessionList
+      GUARDED_BY(monitor_);                                                             // in creation order
+  std::unordered_map<const ReportingdSession*, uint64_t> places_ GUARDED_BY(monitor_);  // in the list
+  uint64_t nextPlace_ GUARDED_BY(monitor_) = 0;
+  SessionCensus census_ GUARDED_BY(monitor_);
   Dictionary _cachedStorebags GUARDED_BY(monitor_);                   // storebag name to entry
   std::optional<uint32_t> cachedStorebagsSize_ GUARDED_BY(monitor_);  // the estimate, until the cache changes
   std::map<std::string, HierarchyGroup, std::less<>> _correlatedSessions GUARDED_BY(monitor_);
@@ -121,6 +128,10 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   std::atomic<size_t> sessionCount_{0};
   std::atomic<size_t> tokenCount_{0};
   std::atomic<bool> stopping_{false};
+
+  // Sessions whose figures may have changed since the last health report. Compared, never followed.
+  Mutex changedMutex_;
+  std::vector<const ReportingdSession*> changedSessions_ GUARDED_BY(changedMutex_);
 
   Mutex endMutex_;
   std::condition_variable ended_;

@@ -50,18 +50,21 @@ bool ReportingdAgent::isIn(const HierarchyGroup& group, const String& token,
 
 void ReportingdAgent::updateCorrelatedSessions(ReportingdSession& session) {
   Log& log = configuration_.platform.log;
-  MonitorLock lock(monitor_);
   const std::optional<String> token = session.hierarchyToken();
   if (!token) {
     log.normal(
         "updateCorrelatedSessions: Session %u has no correlated sessions as it is a standalone session",
         session.sessionID());
-    // A session that drops its token stays registered where it was, with the level it has now.
+    // A standalone session must not wait for somebody's download. One that drops its token stays registered where
+    // it was, with the level it has now.
+    if (!session.wasInHierarchy()) return;
+    MonitorLock lock(monitor_);
     const auto registration = registrations_.find(&session);
     if (registration != registrations_.end())
       _correlatedSessions.at(registration->second.token).relevel(registration->second.place);
     return;
   }
+  MonitorLock lock(monitor_);
   removeFromGroups(session);
   if (group(token) == nullptr && !addGroup(*token, session)) {
     session.becomeStandalone();

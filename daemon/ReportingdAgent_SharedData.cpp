@@ -3,7 +3,6 @@
 #include "daemon/HealthReport.h"
 #include "daemon/ReportingdAgent.h"
 #include "platform/Counters.h"
-#include "platform/Keys.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/ObjectSize.h"
@@ -37,11 +36,30 @@ std::optional<Dictionary> ReportingdAgent::sharedDataForSession(ReportingdSessio
   return token ? _sharedData.dictionary(*token) : std::nullopt;
 }
 
+void ReportingdAgent::sessionFiguresMayHaveChanged(ReportingdSession& session) {
+  MutexLock lock(changedMutex_);
+  changedSessions_.push_back(&session);
+}
+
+// A session may have left the list since it told of a change, or even be gone: only listed ones are looked at.
+void ReportingdAgent::refreshCensus() {
+  std::vector<const ReportingdSession*> changed;
+  {
+    MutexLock lock(changedMutex_);
+    changed.swap(changedSessions_);
+  }
+  for (const ReportingdSession* session : changed) {
+    const auto place = places_.find(session);
+    if (place == places_.end()) continue;
+    ReportingdSession& listed = *_sessionList.at(place->second);
+    listed.figuresAreRead();
+    census_.set(place->second, listed.clientType(), listed.batchedEventsSize());
+  }
+}
+
 uint64_t ReportingdAgent::addSessionHealthInfo(const ReportingdSession& session, HealthReport& healthReport) {
-  const std::optional<Dictionary>& info = session.sessionInfo();
-  const Value* type = info ? info->find(kKYTReportingSessionInfoClientType) : nullptr;
   const uint64_t size = session.batchedEventsSize();
-  healthReport.addSession(type != nullptr ? type->intValue() : 0, size);
+  healthReport.addSession(session.clientType(), size);
   return size;
 }
 
@@ -51,8 +69,8 @@ void ReportingdAgent::addAgentHealthInfoForSession(ReportingdSession& session, D
   Platform& platform = configuration_.platform;
   MonitorLock lock(monitor_);
   HealthReport report;
-  uint64_t batchedEvents = 0;
-  for (const auto& listed : _sessionList) batchedEvents += addSessionHealthInfo(*listed, report);
+  refreshCensus();
+  uint64_t batchedEvents = census_.addTo(report);
   batchedEvents += addSessionHealthInfo(session, report);
   report.write(payload);
   if (!cachedStorebagsSize_) cachedStorebagsSize_ = objectSizeEstimate(_cachedStorebags, platform.memory);

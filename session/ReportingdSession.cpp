@@ -78,17 +78,29 @@ bool ReportingdSession::requiresUserInfo() const {
   return required != nullptr && required->boolValue();
 }
 
-// Under one hold of the monitor, so that no other session finds the new level under the old registration.
+// The exchange makes sure that either the report that has just asked saw the change, or the next one is told.
+void ReportingdSession::figuresMayHaveChanged() {
+  if (!figuresChanged_.exchange(true)) _sessionDelegate.sessionFiguresMayHaveChanged(*this);
+}
+
+// Under one hold of the monitor, so that no other session finds the new level under the old registration. A session
+// that never had a token is found by nobody, and does not wait for the monitor, which somebody's download may hold.
 void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
   countMistakes(sessionInfo, platform());
   const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
   const Value* token = sessionInfo.find(kKYTReportingSessionInfoHierarchyToken);
-  MonitorLock lock(_sessionDelegate.monitor());
+  const Value* type = sessionInfo.find(kKYTReportingSessionInfoClientType);
+  const Dictionary* hierarchy = token != nullptr ? token->dictionary() : nullptr;
+  const Value* tokenID = hierarchy != nullptr ? hierarchy->find(kKYTReportingHierarchyTokenTokenID) : nullptr;
+  if (tokenID != nullptr && !tokenID->isNull()) wasInHierarchy_ = true;
+  std::optional<MonitorLock> lock;
+  if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
   _sessionID = sessionID != nullptr ? sessionID->unsignedIntValue() : 0;
   _sessionInfo = sessionInfo;
   _hierarchyDictionary.reset();
-  if (token != nullptr && token->isDictionary()) _hierarchyDictionary = *token->dictionary();
-  if (_hierarchyDictionary) wasInHierarchy_ = true;
+  if (hierarchy != nullptr) _hierarchyDictionary = *hierarchy;
+  clientType_.store(type != nullptr ? type->intValue() : 0, std::memory_order_relaxed);
+  figuresMayHaveChanged();
   _sessionDelegate.updateCorrelatedSessions(*this);
 }
 
@@ -103,7 +115,8 @@ void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dic
   takeOverIdentity(sessionInfo);
   _frameworks = std::move(frameworksToCheck);
   _userInfo = std::move(userInfo);
-  MonitorLock lock(_sessionDelegate.monitor());
+  std::optional<MonitorLock> lock;
+  if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
   setHasAggregator(hasAggregationBlock);
 }
 
@@ -138,6 +151,7 @@ void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
     MonitorLock lock(_sessionDelegate.monitor());
     std::swap(_backends, backends);
   }
+  figuresMayHaveChanged();
   for (const auto& [key, backend] : backends) backend->cleanup();
 }
 

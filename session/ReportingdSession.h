@@ -4,9 +4,10 @@
 // for each accepted connection; the connection keeps it as its exported object until it is invalidated.
 //
 // Threads: the client's calls and dealloc() run on the connection's queue, one at a time. Sessions of one
-// hierarchy reach into each other while holding the agent's monitor. So fields of the first group below are
-// written only on the connection's queue while holding the monitor, are read there without it, and elsewhere
-// only while holding it; those of the second group are touched on the connection's queue alone.
+// hierarchy reach into each other while holding the agent's monitor. So fields of the second group below are
+// written only on the connection's queue, by a session that was ever in a hierarchy while holding the monitor, are
+// read there without it, and elsewhere only while holding it; those of the last group are touched on the
+// connection's queue alone.
 //
 // Defined in several files by subject: ReportingdSession.cpp (lifecycle and configuration), …_Routing.cpp
 // (the two doors for messages), …_Flush.cpp (flush, uploads, log data), …_States.cpp (states, hierarchy,
@@ -89,9 +90,15 @@ class ReportingdSession final : public ClientSessionInterface,
   [[nodiscard]] uint32_t sessionID() const { return _sessionID; }
   void setSessionID(uint32_t sessionID) { _sessionID = sessionID; }
   [[nodiscard]] const std::optional<Dictionary>& sessionInfo() const { return _sessionInfo; }
+  [[nodiscard]] bool wasInHierarchy() const { return wasInHierarchy_; }
   [[nodiscard]] bool hasAggregator() const { return _hasAggregator.load(std::memory_order_relaxed); }
   void setHasAggregator(bool value) { _hasAggregator.store(value, std::memory_order_relaxed); }
   [[nodiscard]] KYTReportingBackend* backendForKey(std::string_view key) const { return _backends.find(key); }
+
+  // Of the session information; 0 without any. Any thread.
+  [[nodiscard]] int32_t clientType() const { return clientType_.load(std::memory_order_relaxed); }
+  // The health report asks for the client type and the batches' size next: later changes are told again.
+  void figuresAreRead() { figuresChanged_.exchange(false); }
 
   // On the connection's queue.
   void updateReportingStates();
@@ -111,6 +118,7 @@ class ReportingdSession final : public ClientSessionInterface,
 
   // Lifecycle and configuration.
   void takeOverIdentity(const Dictionary& sessionInfo);
+  void figuresMayHaveChanged();
   void createBackendsWithStorebag(const Dictionary& storebag);
   void updateSessionWithDefaultSessionInfo();
   void sendStartMessage();
@@ -152,13 +160,18 @@ class ReportingdSession final : public ClientSessionInterface,
   std::array<char, kDeviceIDSize> _deviceid{};
   uint32_t peerUser_;
 
-  // Written on the connection's queue while holding the monitor.
+  // Written on the connection's queue while holding the monitor. The first three without it by a session that never
+  // was in a hierarchy: nobody else looks at them.
   uint32_t _sessionID = 0;
   std::optional<Dictionary> _sessionInfo;
   std::optional<Dictionary> _hierarchyDictionary;
   Backends _backends;
   std::shared_ptr<Connection> _connection;
   std::atomic<bool> _hasAggregator{false};  // cleared by other sessions too, holding the monitor
+
+  // Synchronised by themselves.
+  std::atomic<int32_t> clientType_{0};
+  std::atomic<bool> figuresChanged_{false};  // and told
 
   // Touched on the connection's queue alone.
   std::optional<Dictionary> _userInfo;

@@ -32,6 +32,9 @@ class ReportingdSessionDelegate {
   virtual void updateSharedDataForSession(ReportingdSession& session, const Dictionary& sharedData) = 0;
   virtual void removeObjectFromSharedDataForSession(ReportingdSession& session, const String& key) = 0;
   [[nodiscard]] virtual std::optional<Dictionary> sharedDataForSession(ReportingdSession& session) = 0;
+  // The session's client type, or what its back ends hold in batches, may be another than at the last health report.
+  // Told after the change, once until the report has asked (figuresAreRead()). Any thread; waits for nobody.
+  virtual void sessionFiguresMayHaveChanged(ReportingdSession& session) = 0;
   // Called while holding monitor().
   virtual void addAgentHealthInfoForSession(ReportingdSession& session, Dictionary& payload) = 0;
 };

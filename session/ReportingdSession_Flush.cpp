@@ -46,6 +46,7 @@ void ReportingdSession::internalFlushMessagesWithCompletion(ResultReply completi
           fanIn->backendFinished(key, name, std::move(result), std::move(error));
         }));
   }
+  figuresMayHaveChanged();
 }
 
 void ReportingdSession::uploadFileAtPath(String fileURL, String extensionToken,

@@ -153,6 +153,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
         (name == kKYTReportingBackendDashboard && answer.isNull()))
       answer = std::move(result);
   }
+  figuresMayHaveChanged();
   return answer;
 }
 

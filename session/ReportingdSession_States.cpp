@@ -75,6 +75,7 @@ void ReportingdSession::updateCombinedSessionID() {
   log().debug("updateCombinedSessionID: Updating combined session ID '%s' for session %u backends",
               combined.c_str(), _sessionID);
   for (const auto& [key, backend] : _backends) backend->setCorrelatedSessionID(combined);
+  figuresMayHaveChanged();  // the records in batches have the identifier
 }
 
 uint64_t ReportingdSession::batchedEventsSize() const {

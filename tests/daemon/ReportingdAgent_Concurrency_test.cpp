@@ -1,5 +1,7 @@
 // Sessions of one hierarchy on several threads, with the real back ends: what the thread sanitizer watches.
 #include <atomic>
+#include <chrono>
+#include <future>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -99,6 +101,30 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
   EXPECT_EQ(agent.sessionCount(), 0U);
   EXPECT_TRUE(agent.waitUntilSessionsHaveEnded(std::chrono::seconds(30)));
   EXPECT_FALSE(transaction_.outOfOrder());
+}
+
+// As when a storebag is being downloaded for somebody else.
+TEST_F(AgentFixture, ASessionWithoutATokenIdentifiesItselfWhileTheMonitorIsHeld) {
+  Client client = connect(), noToken = connect();
+  Dictionary levelAlone = sessionInfo();
+  levelAlone.set(kKYTReportingSessionInfoHierarchyToken, Dictionary{{kKYTReportingHierarchyTokenLevel, 2}});
+  std::promise<void> done;
+  std::future<void> isDone = done.get_future();
+  std::thread calls;
+  {
+    MonitorLock held(agent_.monitor());
+    calls = std::thread([&] {
+      identify(client, sessionInfo(7, 5), true);
+      identify(noToken, levelAlone);
+      done.set_value();
+    });
+    EXPECT_EQ(isDone.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+  }
+  calls.join();
+  EXPECT_TRUE(client.session->hasAggregator());
+  EXPECT_TRUE(
+      logged(LogLevel::normal,
+             "updateCorrelatedSessions: Session 5 has no correlated sessions as it is a standalone session"));
 }
 
 }  // namespace

@@ -116,6 +116,62 @@ TEST_F(AgentHealth, AddsUpWhatSessionsHoldInBatches) {
   EXPECT_GT(payload.find("ProcessMemoryUsage")->unsignedLongLongValue(), 0U);
 }
 
+TEST_F(AgentHealth, TellsWhatChangedSinceTheLastReport) {
+  Client asks = clientWith(sessionInfo(12)), a = clientWith(sessionInfo(7));
+  configure(a);
+  const auto backend = factory_.latest("httppost");
+  const auto batchSize = [&](const char* code) {
+    const Value* size = report(asks).find(std::string("BatchSize_") + code);
+    return size != nullptr ? size->longLongValue() : -1;
+  };
+  EXPECT_EQ(batchSize("QH"), 0);
+  backend->batchSize = 1;
+  a.session->sendMessageWithDictionary(Dictionary{{"Category", 1}, {"Type", 2}}, nullptr);
+  EXPECT_EQ(batchSize("QH"), 1);
+  backend->batchSize = 2;
+  a.session->flushMessagesWithCompletion(nullptr);
+  EXPECT_EQ(batchSize("QH"), 2);
+  identify(a, sessionInfo(20));
+  EXPECT_EQ(batchSize("QH"), -1);
+  EXPECT_EQ(batchSize("QPW"), 2);
+  identify(a, sessionInfoAt(1));  // type 7
+  const Client parent = clientWith(sessionInfoAt(0));
+  EXPECT_EQ(batchSize("QH"), 2);
+  backend->batchSize = 3;
+  agent_.updateDownstreamSessions(*parent.session);
+  EXPECT_EQ(batchSize("QH"), 3) << "another combined identifier changes the records";
+  backend->batchSize = 4;
+  configure(a);
+  EXPECT_EQ(batchSize("QH"), 0) << "new back ends";
+  a.connection->invalidateNow();
+  EXPECT_EQ(batchSize("QH"), 0) << "the parent alone";
+}
+
+// All sessions end at once when the daemon does, and each asks for a report: visiting all for each took seconds
+// for some thousands of them.
+TEST_F(AgentHealth, VisitsOnlySessionsWhoseFiguresMayHaveChanged) {
+  constexpr size_t kSessions = 300;
+  std::vector<Client> clients;
+  for (size_t i = 0; i < kSessions; ++i) {
+    clients.push_back(clientWith(sessionInfo(7)));
+    configure(clients.back());
+  }
+  const auto questions = [&] {
+    uint64_t sum = 0;
+    for (const auto& backend : factory_.made()) sum += backend->sizeQuestions;
+    return sum;
+  };
+  EXPECT_EQ(*report(clients[0]).find("SessionsCount_QH"), Value(kSessions + 1));
+  const uint64_t before = questions();
+  EXPECT_EQ(*report(clients[1]).find("SessionsCount_QH"), Value(kSessions + 1));
+  EXPECT_LE(questions() - before, 2U);
+  for (const Client& client : clients) client.connection->invalidateNow();
+  EXPECT_LE(questions() - before, 4 * kSessions);
+  const auto& last = factory_.made().back()->sent.back();
+  EXPECT_EQ(*last.message.find("ClientData")->dictionary()->find("SessionsCount_QH"), Value(1))
+      << "of itself";
+}
+
 TEST_F(AgentHealth, ReadsASumOfBatchesAsAThirtyTwoBitNumberBeforeItAdds) {
   factory_.prepare = [](RecordingBackend& made) { made.batchSize = 0x1'0000'0001; };
   Client a = clientWith(sessionInfo(7));

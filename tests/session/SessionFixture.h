@@ -31,6 +31,7 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   std::vector<std::string> calls;
   std::vector<Dictionary> updates;
   std::vector<std::string> removedKeys;
+  int changes = 0;  // of figures, told
   std::function<void()> onDownstreamUpdate;
 
   // Whether somebody holds the lock, and so keeps another thread from it.
@@ -75,6 +76,7 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
     lockedCall("shared");
     return sharedData;
   }
+  void sessionFiguresMayHaveChanged(ReportingdSession&) override { ++changes; }
   void addAgentHealthInfoForSession(ReportingdSession&, Dictionary& payload) override {
     lockedCall("health");
     payload.set("Health", 1);

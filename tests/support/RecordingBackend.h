@@ -49,6 +49,7 @@ class RecordingBackend final : public KYTReportingBackend {
   int flushCount = 0, updateCount = 0, cleanupCount = 0, userInfoCount = 0;
   std::vector<std::string> uploadedPaths, tokens, correlatedIDs, calls;
   std::vector<Value> logData;
+  mutable uint64_t sizeQuestions = 0;
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> connectivity() const {
     return connectivityDelegate();
   }
@@ -96,7 +97,10 @@ class RecordingBackend final : public KYTReportingBackend {
     correlatedIDs.push_back(sessionID.str());
     KYTReportingBackend::setCorrelatedSessionID(sessionID);
   }
-  [[nodiscard]] uint64_t batchedEventsSize() const override { return batchSize; }
+  [[nodiscard]] uint64_t batchedEventsSize() const override {
+    ++sizeQuestions;
+    return batchSize;
+  }
 };
 
 // Thread-safe; the back ends that it made are not.
