@@ -118,8 +118,8 @@ bool KYTReportingBackend::uploadLogData(const Value&) {
   return false;
 }
 
-void KYTReportingBackend::setCorrelatedSessionID(const String& sessionID) {
-  setCombinedSessionIDString(sessionID);
+void KYTReportingBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
+  stateQueue_->sync([&] { combinedSessionID_ = sessionID; });
 }
 
 bool KYTReportingBackend::isWhitelistedEvent(uint16_t category) const {
@@ -131,16 +131,19 @@ bool KYTReportingBackend::isBlacklistedEvent(uint16_t category) const {
   return eventBlacklist_ && holdsCategory(*eventBlacklist_, category);
 }
 
-uint64_t KYTReportingBackend::batchedEventsSize() const {
+uint64_t KYTReportingBackend::batchedEventsSize() {
   return 0;
 }
 
 std::optional<String> KYTReportingBackend::combinedSessionIDString() const {
-  return stateQueue_->sync([this] { return combinedSessionIDString_; });
+  const std::optional<SessionIDPath> path = stateQueue_->sync([this] { return combinedSessionID_; });
+  return path ? std::optional<String>(path->text()) : std::nullopt;
 }
 
 void KYTReportingBackend::setCombinedSessionIDString(std::optional<String> value) {
-  stateQueue_->sync([&] { combinedSessionIDString_ = std::move(value); });
+  std::optional<SessionIDPath> path;
+  if (value) path = SessionIDPath(std::move(*value));
+  stateQueue_->sync([&] { combinedSessionID_ = std::move(path); });
 }
 
 Value KYTReportingBackend::samplingThreshold() const {

@@ -18,6 +18,7 @@
 #include <utility>
 
 #include "backend/ReportingSessionConnectivityInterface.h"
+#include "backend/SessionIDPath.h"
 #include "platform/Clock.h"
 #include "platform/Error.h"
 #include "platform/Function.h"
@@ -94,11 +95,11 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] virtual bool uploadFileAtPath(const String& path, const String& extensionToken,
                                               std::optional<FileExtension>& extension);
   [[nodiscard]] virtual bool uploadLogData(const Value& logData);
-  virtual void setCorrelatedSessionID(const String& sessionID);
+  virtual void setCorrelatedSessionID(const SessionIDPath& sessionID);
   // Without a list everything is allowed; an empty list allows nothing.
   [[nodiscard]] bool isWhitelistedEvent(uint16_t category) const;
   [[nodiscard]] bool isBlacklistedEvent(uint16_t category) const;
-  [[nodiscard]] virtual uint64_t batchedEventsSize() const;
+  [[nodiscard]] virtual uint64_t batchedEventsSize();
 
   // Plain properties.
   [[nodiscard]] const String& name() const { return name_; }
@@ -171,7 +172,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::optional<String> productVersion_, buildVersion_, hardwareType_, productFamily_;
   double startTimeStamp_ = 0;  // seconds since 1970
   uint32_t sessionID_ = 0;
-  std::optional<String> combinedSessionIDString_;  // touched on the state queue only
+  std::optional<SessionIDPath> combinedSessionID_;  // touched on the state queue only
   int32_t compType_ = 0;
   uint16_t clientVersion_ = 0;
   uint16_t eventID_ = 0;

@@ -56,13 +56,14 @@ HierarchyGroup::Runs HierarchyGroup::runs() const {
     const uint32_t level = key.first;
     if (last == nullptr || level > next) {
       last = &runs[level];
+      last->identifiers = std::make_shared<std::string>();
       next = level;
     } else if (level < next) {
       continue;  // not the first of its level
     }
-    if (!last->ends.empty()) last->identifiers += '.';
-    last->identifiers += session->sessionIDString().view();
-    last->ends.push_back(last->identifiers.size());
+    if (!last->ends.empty()) *last->identifiers += '.';
+    *last->identifiers += session->sessionIDString().view();
+    last->ends.push_back(last->identifiers->size());
     ++next;
   }
   return runs;
@@ -75,8 +76,7 @@ HierarchyGroup::Ancestors HierarchyGroup::ancestorsOf(uint32_t level) const {
   if (found == runs_->begin()) return {};
   const auto& [first, run] = *--found;
   if (level - first > run.ends.size()) return {};
-  const std::string_view text = run.identifiers;
-  return {String(text.substr(0, run.ends[level - first - 1])), first == 0};
+  return {AncestorIdentifiers{run.identifiers, run.ends[level - first - 1]}, first == 0};
 }
 
 }  // namespace kyt

@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Value.h"
+#include "backend/SessionIDPath.h"
 
 namespace kyt {
 
@@ -39,7 +39,7 @@ class HierarchyGroup {
   // sessions of the levels right above it, up to the first level that nobody holds. None when that is the
   // next one above.
   struct Ancestors {
-    std::optional<String> identifiers;
+    std::optional<AncestorIdentifiers> identifiers;
     bool complete = false;  // up to level 0
   };
   [[nodiscard]] Ancestors ancestorsOf(uint32_t level) const;
@@ -53,10 +53,10 @@ class HierarchyGroup {
 
  private:
   // Levels that follow one another without a gap. What stands above a level is the beginning of its run's
-  // text, so that thousands of levels beneath each other cost no more than they are long.
+  // text, which all share, so that thousands of levels beneath each other cost no more than they are long.
   struct Run {
-    std::string identifiers;   // of all its levels
-    std::vector<size_t> ends;  // of each level's identifier
+    std::shared_ptr<std::string> identifiers;  // of all its levels
+    std::vector<size_t> ends;                  // of each level's identifier
   };
   using Runs = std::map<uint32_t, Run>;  // by the first level
   [[nodiscard]] Runs runs() const;

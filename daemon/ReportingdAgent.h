@@ -62,7 +62,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   [[nodiscard]] Monitor& monitor() override { return monitor_; }
   std::optional<Dictionary> storebagForSession(ReportingdSession& session) override;
   std::optional<String> storebagVersionForSession(ReportingdSession& session) override;
-  std::optional<String> parentSessionIDStringForSession(ReportingdSession& session) override;
+  std::optional<AncestorIdentifiers> parentSessionIDStringForSession(ReportingdSession& session) override;
   void updateCorrelatedSessions(ReportingdSession& session) override;
   std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(ReportingdSession& session) override;
   void updateDownstreamSessions(ReportingdSession& session) override;

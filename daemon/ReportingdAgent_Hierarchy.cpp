@@ -77,7 +77,8 @@ void ReportingdAgent::updateCorrelatedSessions(ReportingdSession& session) {
   registrations_[&session] = Registration{token->str(), place};
 }
 
-std::optional<String> ReportingdAgent::parentSessionIDStringForSession(ReportingdSession& session) {
+std::optional<AncestorIdentifiers> ReportingdAgent::parentSessionIDStringForSession(
+    ReportingdSession& session) {
   Log& log = configuration_.platform.log;
   MonitorLock lock(monitor_);
   const std::optional<String> token = session.hierarchyToken();
@@ -96,12 +97,14 @@ std::optional<String> ReportingdAgent::parentSessionIDStringForSession(Reporting
                session.sessionID(), token->c_str());
     return std::nullopt;
   }
-  const HierarchyGroup::Ancestors ancestors = sessions->ancestorsOf(level);
-  if (!ancestors.complete)
+  HierarchyGroup::Ancestors ancestors = sessions->ancestorsOf(level);
+  if (!ancestors.complete) {
+    const std::string_view found = ancestors.identifiers ? ancestors.identifiers->view() : "(null)";
     log.normal(
-        "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%s'",
-        ancestors.identifiers ? ancestors.identifiers->c_str() : "(null)");
-  return ancestors.identifiers;
+        "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%.*s'",
+        static_cast<int>(found.size()), found.data());
+  }
+  return std::move(ancestors.identifiers);
 }
 
 std::shared_ptr<ReportingdSession> ReportingdAgent::parentSessionForChild(ReportingdSession& session) {

@@ -1,5 +1,6 @@
 #include "platform/Log.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <string>
 #include <utility>
@@ -33,7 +34,10 @@ void Log::error(const char* format, ...) {
 }
 
 void Log::debugObjects(const char* format, std::initializer_list<Value> objects) {
-  if (enabled(LogLevel::debug)) writeLine(LogLevel::debug, formatObjects(format, objects));
+  if (!enabled(LogLevel::debug)) return;
+  std::string line = formatObjects(format, objects);
+  const size_t whole = line.size();
+  writeLine(LogLevel::debug, std::move(line), whole);
 }
 
 void Log::write(LogLevel level, const char* format, va_list arguments) {
@@ -46,16 +50,17 @@ void Log::write(LogLevel level, const char* format, va_list arguments) {
   } else if (static_cast<size_t>(length) < sizeof buffer) {
     sink_->write(level, std::string_view(buffer, static_cast<size_t>(length)));
   } else {
-    std::string line(static_cast<size_t>(length), '\0');
+    // No more of it than is shown, and one byte, so that the cut does not go through a character.
+    const auto whole = static_cast<size_t>(length);
+    std::string line(std::min(whole, Limits::maxLogLineBytes + 1), '\0');
     std::vsnprintf(line.data(), line.size() + 1, format, again);
-    writeLine(level, std::move(line));
+    writeLine(level, std::move(line), whole);
   }
   va_end(again);
 }
 
-void Log::writeLine(LogLevel level, std::string line) {
-  if (line.size() > Limits::maxLogLineBytes) {
-    const size_t whole = line.size();
+void Log::writeLine(LogLevel level, std::string line, size_t whole) {
+  if (whole > Limits::maxLogLineBytes) {
     size_t end = Limits::maxLogLineBytes;
     // Not within a character.
     for (int back = 0; back < 3 && (static_cast<unsigned char>(line[end]) & 0xC0) == 0x80; ++back) --end;

@@ -53,7 +53,8 @@ class Log {
 
  private:
   void write(LogLevel level, const char* format, va_list arguments) __attribute__((format(printf, 3, 0)));
-  void writeLine(LogLevel level, std::string line);
+  // `line`: all `whole` bytes of it, or more than are shown.
+  void writeLine(LogLevel level, std::string line, size_t whole);
   LogSink* sink_;
   std::atomic<int> level_;
 };

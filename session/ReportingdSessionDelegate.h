@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 
+#include "backend/SessionIDPath.h"
 #include "platform/Mutex.h"
 #include "platform/Value.h"
 
@@ -22,7 +23,8 @@ class ReportingdSessionDelegate {
   // The section for the session's client type, from the cache or freshly fetched (blocks), or none.
   [[nodiscard]] virtual std::optional<Dictionary> storebagForSession(ReportingdSession& session) = 0;
   [[nodiscard]] virtual std::optional<String> storebagVersionForSession(ReportingdSession& session) = 0;
-  [[nodiscard]] virtual std::optional<String> parentSessionIDStringForSession(ReportingdSession& session) = 0;
+  [[nodiscard]] virtual std::optional<AncestorIdentifiers> parentSessionIDStringForSession(
+      ReportingdSession& session) = 0;
   virtual void updateCorrelatedSessions(ReportingdSession& session) = 0;
   [[nodiscard]] virtual std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(
       ReportingdSession& session) = 0;

@@ -69,11 +69,13 @@ void ReportingdSession::syncReportingStates() {
 }
 
 void ReportingdSession::updateCombinedSessionID() {
-  const std::optional<String> parentID = _sessionDelegate.parentSessionIDStringForSession(*this);
+  std::optional<AncestorIdentifiers> parentID = _sessionDelegate.parentSessionIDStringForSession(*this);
   if (!parentID) return;
-  const String combined(formatObjects("%@.%@", {*parentID, _sessionIDString}));
-  log().debug("updateCombinedSessionID: Updating combined session ID '%s' for session %u backends",
-              combined.c_str(), _sessionID);
+  const SessionIDPath combined(std::move(*parentID), _sessionIDString);
+  // Joined for its line alone.
+  if (log().debugEnabled())
+    log().debug("updateCombinedSessionID: Updating combined session ID '%s' for session %u backends",
+                combined.text().c_str(), _sessionID);
   for (const auto& [key, backend] : _backends) backend->setCorrelatedSessionID(combined);
   figuresMayHaveChanged();  // the records in batches have the identifier
 }

@@ -107,7 +107,7 @@ void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
 
 Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                                     uint16_t respCode, EventID, MessageFlag flag) {
-  const Shared now = stateQueue().sync([this] { return Shared{state_, combinedSessionIDString_}; });
+  const Shared now = stateQueue().sync([this] { return Shared{state_, combinedSessionID_}; });
   const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
     platform_.counters.add(Reason::eventDroppedByState);
@@ -117,7 +117,9 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
   if (isSessionStop(method, respCode)) addStopEntries(payload);
   const Value* shared = message.find(kKYTReportingMessageBlobSharedData);
   const Dictionary* frameworkData = shared != nullptr ? shared->dictionary() : nullptr;
-  Dictionary record = makeRecord(std::move(payload), timestamp, method, respCode, now.sessionID,
+  std::optional<String> sessionID;
+  if (now.sessionID) sessionID = now.sessionID->text();
+  Dictionary record = makeRecord(std::move(payload), timestamp, method, respCode, sessionID,
                                  frameworkData != nullptr ? frameworkData->size() : 0);
   prepareEventForMessage(record, frameworkData);
   // This message is deliberately still handled with the old state: it is the last of the batch that it frees.

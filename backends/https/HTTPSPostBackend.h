@@ -44,8 +44,8 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void updateState() override;
   Value flushMessagesWithCompletion(FlushCompletion completion) override;
   // Writes it into every record of the batch too.
-  void setCorrelatedSessionID(const String& sessionID) override;
-  [[nodiscard]] uint64_t batchedEventsSize() const override;
+  void setCorrelatedSessionID(const SessionIDPath& sessionID) override;
+  [[nodiscard]] uint64_t batchedEventsSize() override;
 
   // The record of one event: a copy of the payload, and the fixed keys over it. `eventID` is ignored.
   [[nodiscard]] Dictionary newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
@@ -92,7 +92,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   enum class BatchTaking { nothing, discarded, userInfoMissing, taken };
   struct Shared {  // what other sessions may change
     int32_t state = kBackendStateUndecided;
-    std::optional<String> sessionID;
+    std::optional<SessionIDPath> sessionID;
   };
   struct Client {  // what the user information calls the client, null where it does not
     const String* name = nullptr;
@@ -132,6 +132,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void forgetSizesOnQueue();
   void appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes);
   void countDroppedByLimit() const;
+  void writeSessionIDOnQueue();
   [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records, uint64_t& bytes);
   [[nodiscard]] bool admits(const Dictionary& record) const;
   [[nodiscard]] Array recordsToPost(Array batch, uint64_t bytes) const;
@@ -177,7 +178,8 @@ class HTTPSPostBackend : public KYTReportingBackend {
   // The state queue.
   std::optional<Array> batchedEvents_;
   std::vector<std::pair<int32_t, int32_t>> eventMethodCounts_;  // method, records of it in the batch; sorted
-  uint64_t batchedBytes_ = 0;  // estimate of what the batch holds, for the limit alone
+  bool batchHasOldSessionID_ = false;  // written into the records when somebody reads them
+  uint64_t batchedBytes_ = 0;          // estimate of what the batch holds, for the limit alone
   // The size that the health report shows, of so many records at the beginning of the batch.
   mutable size_t sizedRecords_ = 0;
   mutable uint64_t sizeOfRecords_ = 0;

@@ -64,6 +64,7 @@ int32_t HTTPSPostBackend::countOnQueue(int32_t method) const {
 }
 
 void HTTPSPostBackend::appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes) {
+  writeSessionIDOnQueue();  // the new record has its own
   if (!batchedEvents_) batchedEvents_.emplace();
   batchedEvents_->append(std::move(record));
   batchedBytes_ += bytes;
@@ -119,6 +120,7 @@ HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records,
   if (!batchedEvents_) return BatchTaking::nothing;
   const bool enabled = state_ == kBackendStateEnabled;
   if (enabled && requireUserInfo_ && !hasUserInfo()) return BatchTaking::userInfoMissing;
+  writeSessionIDOnQueue();
   records = std::move(*batchedEvents_);
   batchedEvents_.reset();
   eventMethodCounts_.clear();
@@ -220,21 +222,29 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   return records;
 }
 
-void HTTPSPostBackend::setCorrelatedSessionID(const String& sessionID) {
+// Whoever joins a hierarchy changes the identifiers of all sessions beneath, and holds the agent's monitor
+// meanwhile: the records wait until their own session takes or adds to them.
+void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
   stateQueue().sync([&] {
-    combinedSessionIDString_ = sessionID;
+    combinedSessionID_ = sessionID;
     if (!batchedEvents_) return;
     forgetSizesOnQueue();
-    Value* values = batchedEvents_->mutableBegin();
-    for (size_t i = 0; i < batchedEvents_->size(); ++i)
-      values[i].mutableDictionary()->set("_sessionID", Value(sessionID));
+    batchHasOldSessionID_ = true;
   });
 }
 
-// Every session's end asks every other session's back ends, so records that were sized before are not sized
-// again.
-uint64_t HTTPSPostBackend::batchedEventsSize() const {
+void HTTPSPostBackend::writeSessionIDOnQueue() {
+  if (!std::exchange(batchHasOldSessionID_, false) || !batchedEvents_ || !combinedSessionID_) return;
+  const Value sessionID(combinedSessionID_->text());
+  Value* values = batchedEvents_->mutableBegin();
+  for (size_t i = 0; i < batchedEvents_->size(); ++i)
+    values[i].mutableDictionary()->set("_sessionID", sessionID);
+}
+
+// The ends of other sessions ask too, so records that were sized before are not sized again.
+uint64_t HTTPSPostBackend::batchedEventsSize() {
   return stateQueue().sync([this] {
+    writeSessionIDOnQueue();
     const size_t count = batchedEvents_ ? batchedEvents_->size() : 0;
     for (; sizedRecords_ < count; ++sizedRecords_)
       sizeOfRecords_ += objectSizeEstimate((*batchedEvents_)[sizedRecords_], platform_.memory);

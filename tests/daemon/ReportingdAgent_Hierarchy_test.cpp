@@ -7,8 +7,8 @@ namespace {
 class AgentHierarchy : public AgentFixture {
  protected:
   std::optional<std::string> parentID(const Client& client) {
-    const std::optional<String> id = agent_.parentSessionIDStringForSession(*client.session);
-    return id ? std::optional<std::string>(id->str()) : std::nullopt;
+    const std::optional<AncestorIdentifiers> id = agent_.parentSessionIDStringForSession(*client.session);
+    return id ? std::optional<std::string>(id->view()) : std::nullopt;
   }
   static std::string id(const Client& client) { return client.session->sessionIDString().str(); }
 };
@@ -278,6 +278,36 @@ TEST_F(AgentHierarchy, ALevelThatComesOrGoesChangesWhatIsAboveTheOthers) {
   identify(moves, sessionInfo());
   EXPECT_EQ(parentID(c), std::nullopt) << "its level is 0 now";
   EXPECT_EQ(parentID(d), id(c));
+}
+
+// Each session that comes changes the identifiers of all beneath it. They are joined when somebody reads them: joined at
+// once, the cost of a hierarchy was the cube of its depth, while every other session waited.
+TEST_F(AgentHierarchy, IdentifiersAreJoinedWhenTheyAreRead) {
+  constexpr int kLevels = 300;
+  std::vector<Client> clients(kLevels);
+  std::vector<std::shared_ptr<RecordingBackend>> backends(kLevels);
+  const auto add = [&](int level) {
+    clients[level] = clientWith(sessionInfoAt(level));
+    configure(clients[level]);
+    backends[level] = factory_.latest("httppost");
+  };
+  test_.log.setLevel(LogLevel::error);
+  add(0);
+  for (int level = kLevels - 1; level > 0; --level) add(level);
+  for (int level = 1; level < kLevels; ++level) {
+    ASSERT_FALSE(backends[level]->correlatedIDs.empty());
+    for (const SessionIDPath& path : backends[level]->correlatedIDs) ASSERT_FALSE(path.isJoined()) << level;
+  }
+  const auto above = [&](int level) {
+    return agent_.parentSessionIDStringForSession(*clients[level].session);
+  };
+  EXPECT_EQ(above(kLevels - 1)->text, above(1)->text) << "one text for all";
+  std::string expected = id(clients[0]);
+  for (int level = 1; level < kLevels; ++level) {
+    expected += "." + id(clients[level]);
+    ASSERT_EQ(backends[level]->combinedSessionIDString(), String(expected)) << level;
+  }
+  EXPECT_TRUE(backends[1]->correlatedIDs.back().isJoined()) << "once";
 }
 
 // A client may stack all its connections. What stands above each is copied from one text; joined anew level

@@ -79,7 +79,8 @@ TEST_F(SessionStates, CombinesItsIDWithTheParents) {
   delegate_.parentID = String("A.B");
   client_.session->updateCombinedSessionID();
   const std::string combined = "A.B." + client_.session->sessionIDString().str();
-  EXPECT_EQ(backend("httppost").correlatedIDs, std::vector<std::string>{combined});
+  ASSERT_EQ(backend("httppost").correlatedIDs.size(), 1U);
+  EXPECT_EQ(backend("httppost").correlatedIDs[0].text(), String(combined));
   EXPECT_TRUE(logged(LogLevel::debug, "updateCombinedSessionID: Updating combined session ID '" + combined +
                                           "' for session 42 backends"));
 }

@@ -26,7 +26,7 @@ namespace kyt {
 class FakeSessionDelegate final : public ReportingdSessionDelegate {
  public:
   std::optional<Dictionary> storebag, sharedData;
-  std::optional<String> storebagVersion, parentID;
+  std::optional<String> storebagVersion, parentID;  // the latter: of parentSessionIDStringForSession()
   std::shared_ptr<ReportingdSession> parent, ancestor;
   std::vector<std::string> calls;
   std::vector<Dictionary> updates;
@@ -51,7 +51,10 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
     return storebag;
   }
   std::optional<String> storebagVersionForSession(ReportingdSession&) override { return storebagVersion; }
-  std::optional<String> parentSessionIDStringForSession(ReportingdSession&) override { return parentID; }
+  std::optional<AncestorIdentifiers> parentSessionIDStringForSession(ReportingdSession&) override {
+    if (!parentID) return std::nullopt;
+    return AncestorIdentifiers{std::make_shared<std::string>(parentID->str()), parentID->size()};
+  }
   void updateCorrelatedSessions(ReportingdSession& session) override {
     calls.push_back("correlated " + std::to_string(session.hierarchyLevel()));
   }

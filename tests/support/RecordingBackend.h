@@ -47,9 +47,10 @@ class RecordingBackend final : public KYTReportingBackend {
   std::vector<Sent> sent;
   std::vector<FlushCompletion> flushes;
   int flushCount = 0, updateCount = 0, cleanupCount = 0, userInfoCount = 0;
-  std::vector<std::string> uploadedPaths, tokens, correlatedIDs, calls;
+  std::vector<std::string> uploadedPaths, tokens, calls;
+  std::vector<SessionIDPath> correlatedIDs;
   std::vector<Value> logData;
-  mutable uint64_t sizeQuestions = 0;
+  uint64_t sizeQuestions = 0;
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> connectivity() const {
     return connectivityDelegate();
   }
@@ -93,11 +94,11 @@ class RecordingBackend final : public KYTReportingBackend {
     ++userInfoCount;
     KYTReportingBackend::setUserInfoDict(std::move(value));
   }
-  void setCorrelatedSessionID(const String& sessionID) override {
-    correlatedIDs.push_back(sessionID.str());
+  void setCorrelatedSessionID(const SessionIDPath& sessionID) override {
+    correlatedIDs.push_back(sessionID);
     KYTReportingBackend::setCorrelatedSessionID(sessionID);
   }
-  [[nodiscard]] uint64_t batchedEventsSize() const override {
+  [[nodiscard]] uint64_t batchedEventsSize() override {
     ++sizeQuestions;
     return batchSize;
   }
