@@ -1,4 +1,6 @@
 // Which sessions belong together, who is whose parent, and who aggregates for whom.
+#include <string>
+#include <string_view>
 #include <utility>
 
 #include "daemon/ReportingdAgent.h"
@@ -9,6 +11,18 @@
 #include "session/ReportingdSession.h"
 
 namespace kyt {
+
+namespace {
+
+// Forty levels: each session that joins a hierarchy with a gap writes a line for every session beneath it.
+constexpr size_t kMostShownOfAPath = 1024;  // bytes
+
+std::string shownPath(std::string_view path) {
+  if (path.size() <= kMostShownOfAPath) return std::string(path);
+  return std::string(path.substr(0, kMostShownOfAPath)) + " (cut)";
+}
+
+}  // namespace
 
 void ReportingdAgent::removeFromGroups(ReportingdSession& session) {
   const auto registration = registrations_.find(&session);
@@ -99,10 +113,10 @@ std::optional<AncestorIdentifiers> ReportingdAgent::parentSessionIDStringForSess
   }
   HierarchyGroup::Ancestors ancestors = sessions->ancestorsOf(level);
   if (!ancestors.complete) {
-    const std::string_view found = ancestors.identifiers ? ancestors.identifiers->view() : "(null)";
+    const std::string found = ancestors.identifiers ? shownPath(ancestors.identifiers->view()) : "(null)";
     log.normal(
-        "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%.*s'",
-        static_cast<int>(found.size()), found.data());
+        "parentSessionIDStringForSession: Found a gap in hierarchy (one of parents missing): incomplete parentSessionID is '%s'",
+        found.c_str());
   }
   return std::move(ancestors.identifiers);
 }

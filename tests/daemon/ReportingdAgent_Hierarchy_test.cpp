@@ -47,6 +47,14 @@ TEST_F(AgentHierarchy, AGapGivesThePartBelowIt) {
           id(c) + "'"));
 }
 
+TEST_F(AgentHierarchy, TheGapLineShowsTheBeginningOfALongPath) {
+  std::vector<Client> clients;
+  for (int level = 1; level <= 60; ++level) clients.push_back(clientWith(sessionInfoAt(level)));
+  const std::string path = *parentID(clients.back());
+  ASSERT_GT(path.size(), 1024U);
+  EXPECT_TRUE(logged(LogLevel::normal, "incomplete parentSessionID is '" + path.substr(0, 1024) + " (cut)'"));
+}
+
 TEST_F(AgentHierarchy, ALevelTwoSessionWithoutARootGetsItsParentsIDAndTheGapLine) {
   const Client b = clientWith(sessionInfoAt(1)), c = clientWith(sessionInfoAt(2));
   EXPECT_EQ(parentID(c), id(b));

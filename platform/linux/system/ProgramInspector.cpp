@@ -104,7 +104,7 @@ std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspe
 
 Answer ProgramInspectorProcess::ask(int32_t pid) {
   const BlockingScope blocking;
-  const MutexLock lock(mutex_);
+  const GateLock lock(asking_);
   Answer failed;
   failed.error = ETIMEDOUT;
   // Each question has one answer, in order. While those of earlier ones are missing the helper stands still; who waited

@@ -11,7 +11,7 @@
 #include <string>
 #include <variant>
 
-#include "platform/Mutex.h"
+#include "platform/Gate.h"
 #include "platform/linux/system/HelperProcess.h"
 
 namespace kyt {
@@ -48,16 +48,16 @@ class ProgramInspectorProcess final : public ProgramInspector {
   [[nodiscard]] static std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> start();
   // Waits for the answer, two seconds at most. One that stands still is waited for once: until it has answered that
   // question all others fail at once (ETIMEDOUT).
-  [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(mutex_);
-  [[nodiscard]] std::string programPath(int32_t pid) override EXCLUDES(mutex_);
+  [[nodiscard]] std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override EXCLUDES(asking_);
+  [[nodiscard]] std::string programPath(int32_t pid) override EXCLUDES(asking_);
 
  private:
   explicit ProgramInspectorProcess(std::unique_ptr<HelperProcess> process) : process_(std::move(process)) {}
-  [[nodiscard]] ProgramAnswer ask(int32_t pid) EXCLUDES(mutex_);
+  [[nodiscard]] ProgramAnswer ask(int32_t pid) EXCLUDES(asking_);
 
-  Mutex mutex_;
-  const std::unique_ptr<HelperProcess> process_ PT_GUARDED_BY(mutex_);
-  unsigned unanswered_ GUARDED_BY(mutex_) = 0;
+  Gate asking_;
+  const std::unique_ptr<HelperProcess> process_ PT_GUARDED_BY(asking_);
+  unsigned unanswered_ GUARDED_BY(asking_) = 0;
 };
 
 }  // namespace kyt

@@ -78,10 +78,16 @@ void TomlEntitlements::refresh() {
            std::none_of(files_.begin(), files_.end(),
                         [&](const File& file) { return file.path == entry.first; });
   });
+  auto grants = std::make_shared<std::vector<EntitlementGrant>>();
+  for (const File& file : files_) grants->insert(grants->end(), file.grants.begin(), file.grants.end());
+  grants_ = std::move(grants);
 }
 
 void TomlEntitlements::sayOnce(const std::string& why) {
-  if (std::exchange(saidNoInspection_, true)) return;
+  {
+    MutexLock lock(mutex_);
+    if (std::exchange(saidNoInspection_, true)) return;
+  }
   log_.error("entitlements: Grants by executable cannot match: %s", why.c_str());
 }
 
@@ -90,18 +96,20 @@ std::string TomlEntitlements::executableOf(const PeerCredentials& peer) {
   return EntitlementMatch(peer, inspector_).isAlive() ? path : std::string();
 }
 
-Value TomlEntitlements::valueFor(const PeerCredentials& peer, std::string_view key) {
+std::shared_ptr<const std::vector<EntitlementGrant>> TomlEntitlements::currentGrants() {
   MutexLock lock(mutex_);
   refresh();
+  return grants_;
+}
+
+Value TomlEntitlements::valueFor(const PeerCredentials& peer, std::string_view key) {
+  const auto grants = currentGrants();
   Value result;
   EntitlementMatch match(peer, inspector_);
-  for (const File& file : files_) {
-    for (const EntitlementGrant& grant : file.grants) {
-      const auto value = grant.values.find(key);
-      if (value == grant.values.end() || !match.matches(grant)) continue;
-      if (result.isNull() || value->second.boolValue()) result = value->second;
-      if (result.boolValue()) break;
-    }
+  for (const EntitlementGrant& grant : *grants) {
+    const auto value = grant.values.find(key);
+    if (value == grant.values.end() || !match.matches(grant)) continue;
+    if (result.isNull() || value->second.boolValue()) result = value->second;
     if (result.boolValue()) break;
   }
   if (match.lack()) sayOnce(*match.lack());

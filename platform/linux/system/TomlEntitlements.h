@@ -3,10 +3,11 @@
 //
 // The files are looked at (a stat each) for every connection and read again when they changed. What the machine cannot
 // read at the moment (no descriptor, no memory) keeps its former grants, is tried again for the next connection, and is
-// logged at most once a minute.
+// logged at most once a minute. What a peer runs, which may take long to learn, is asked with nothing locked.
 #pragma once
 
 #include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -44,6 +45,7 @@ class TomlEntitlements final : public Entitlements {
     FileIdentity identity;
     std::vector<EntitlementGrant> grants;
   };
+  [[nodiscard]] std::shared_ptr<const std::vector<EntitlementGrant>> currentGrants() EXCLUDES(mutex_);
   void refresh() REQUIRES(mutex_);
   [[nodiscard]] bool isCurrent() const REQUIRES(mutex_);
   [[nodiscard]] std::vector<std::string> paths(const std::vector<File>& former) REQUIRES(mutex_);
@@ -51,7 +53,7 @@ class TomlEntitlements final : public Entitlements {
   void report(const std::string& path, const FileIdentity& identity, const TomlError& problem)
       REQUIRES(mutex_);
   void reportMomentary(const std::string& path, int error) REQUIRES(mutex_);
-  void sayOnce(const std::string& why) REQUIRES(mutex_);
+  void sayOnce(const std::string& why) EXCLUDES(mutex_);
 
   const TomlEntitlementsOptions options_;
   ProgramInspector& inspector_;
@@ -63,6 +65,7 @@ class TomlEntitlements final : public Entitlements {
   bool saidNoInspection_ GUARDED_BY(mutex_) = false;
   FileIdentity folder_ GUARDED_BY(mutex_);
   std::vector<File> files_ GUARDED_BY(mutex_);
+  std::shared_ptr<const std::vector<EntitlementGrant>> grants_ GUARDED_BY(mutex_);  // of all files
   std::map<std::string, FileIdentity> reported_ GUARDED_BY(mutex_);
 };
 

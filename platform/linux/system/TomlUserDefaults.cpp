@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "platform/Limits.h"
+#include "platform/WorkerPool.h"
 
 namespace kyt {
 namespace {
@@ -83,7 +84,8 @@ Dictionary TomlUserDefaults::values(std::string_view domain) {
 }
 
 std::optional<Error> TomlUserDefaults::set(std::string_view domain, std::string_view key, Value value) {
-  MutexLock lock(writeMutex_);
+  const BlockingScope blocking;
+  const GateLock lock(writing_);
   auto result = store(domain, key, std::move(value), Mode::replace);
   if (auto* error = std::get_if<Error>(&result)) return std::move(*error);
   return std::nullopt;
@@ -92,7 +94,8 @@ std::optional<Error> TomlUserDefaults::set(std::string_view domain, std::string_
 String TomlUserDefaults::stringOrStore(std::string_view domain, std::string_view key, String value) {
   const Value known = this->value(domain, key);
   if (known.string() != nullptr) return *known.string();
-  MutexLock lock(writeMutex_);
+  const BlockingScope blocking;
+  const GateLock lock(writing_);
   auto result = store(domain, key, Value(value), Mode::keepString);
   if (const auto* error = std::get_if<Error>(&result)) {
     if (counters_.addAndMayLog(Reason::customIdentifierRefused, clock_.monotonic())) {
@@ -104,6 +107,23 @@ String TomlUserDefaults::stringOrStore(std::string_view domain, std::string_view
   return stored != nullptr ? *stored : value;
 }
 
+// False: errno says why.
+bool TomlUserDefaults::lockWithinPatience(const std::string& domain, int file) {
+  while (::flock(file, LOCK_EX | LOCK_NB) != 0) {
+    if (errno != EWOULDBLOCK && errno != EINTR) return false;
+    const MonotonicTime now = std::chrono::steady_clock::now();
+    MonotonicTime& deadline = lockDeadlines_.try_emplace(domain, now + options_.lockWait).first->second;
+    if (now >= deadline + options_.lockPause) deadline = now + options_.lockWait;
+    if (now >= deadline) {
+      errno = ETIMEDOUT;
+      return false;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  lockDeadlines_.erase(domain);
+  return true;
+}
+
 std::variant<FileHandle, Error> TomlUserDefaults::lockDomain(const std::string& domain) {
   const std::string name = path(domain, ".lock");
   FileHandle file(::open(name.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
@@ -113,12 +133,7 @@ std::variant<FileHandle, Error> TomlUserDefaults::lockDomain(const std::string& 
       status.st_uid != folder.st_uid) {
     adoptOwner(file.get(), folder.st_uid, folder.st_gid);
   }
-  const auto deadline = std::chrono::steady_clock::now() + options_.lockWait;
-  while (::flock(file.get(), LOCK_EX | LOCK_NB) != 0) {
-    if (errno != EWOULDBLOCK && errno != EINTR) return systemFailure(errno, name);
-    if (std::chrono::steady_clock::now() >= deadline) return systemFailure(ETIMEDOUT, name);
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
+  if (!lockWithinPatience(domain, file.get())) return systemFailure(errno, name);
   return file;
 }
 

@@ -1,8 +1,9 @@
 // User defaults as one flat TOML file a domain, in a folder of the daemon's own. Read on every access (a
 // stat; the content only after a change), so that an administrator's change counts at once.
 //
-// Writers of any process exclude each other by a lock file beside the file (DOMAIN.lock; at most five seconds
-// are waited for it). A file is replaced by renaming a complete, synced one over it: whoever reads, and
+// Writers of any process exclude each other by a lock file beside the file (DOMAIN.lock). Of this process one writes at a
+// time; all of them wait five seconds at most for a lock that somebody keeps, and then fail at once for a minute, unless
+// it is free again. Who writes, or waits to, announces it to the worker pool (BlockingScope). A file is replaced by renaming a complete, synced one over it: whoever reads, and
 // whatever crashes when, there is the old content or the new. Mode and, as far as this process may, owner and
 // group of the file are kept; a new file gets those of the folder and mode 0640.
 //
@@ -20,6 +21,7 @@
 
 #include "platform/Clock.h"
 #include "platform/Counters.h"
+#include "platform/Gate.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "platform/UserDefaults.h"
@@ -32,6 +34,7 @@ struct TomlUserDefaultsOptions {
   Duration lockWait = std::chrono::seconds(5);
   // For tests: told the name of each step of a replacement as it is reached.
   void (*step)(const char* name) = nullptr;
+  Duration lockPause = std::chrono::seconds(60);  // how long it is not waited for again
 };
 
 class TomlUserDefaults final : public UserDefaults {
@@ -43,9 +46,9 @@ class TomlUserDefaults final : public UserDefaults {
 
   [[nodiscard]] Value value(std::string_view domain, std::string_view key) override EXCLUDES(mutex_);
   [[nodiscard]] std::optional<Error> set(std::string_view domain, std::string_view key, Value value) override
-      EXCLUDES(writeMutex_);
+      EXCLUDES(writing_);
   [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value) override
-      EXCLUDES(mutex_, writeMutex_);
+      EXCLUDES(mutex_, writing_);
 
   // All values of a domain, by key.
   [[nodiscard]] Dictionary values(std::string_view domain) EXCLUDES(mutex_);
@@ -57,10 +60,11 @@ class TomlUserDefaults final : public UserDefaults {
   enum class Mode { replace, keepString };
   // What is stored afterwards, or an error.
   std::variant<Value, Error> store(std::string_view domain, std::string_view key, Value value, Mode mode)
-      REQUIRES(writeMutex_);
-  std::optional<Error> replaceFile(const std::string& domain, std::string_view text) REQUIRES(writeMutex_);
+      REQUIRES(writing_);
+  std::optional<Error> replaceFile(const std::string& domain, std::string_view text) REQUIRES(writing_);
   const FlatToml& current(std::string_view domain) REQUIRES(mutex_);
-  std::variant<FileHandle, Error> lockDomain(const std::string& domain) REQUIRES(writeMutex_);
+  std::variant<FileHandle, Error> lockDomain(const std::string& domain) REQUIRES(writing_);
+  [[nodiscard]] bool lockWithinPatience(const std::string& domain, int file) REQUIRES(writing_);
   [[nodiscard]] std::string path(std::string_view domain, std::string_view suffix) const;
   void reached(const char* step) const {
     if (options_.step != nullptr) options_.step(step);
@@ -70,7 +74,9 @@ class TomlUserDefaults final : public UserDefaults {
   Log& log_;
   Counters& counters_;
   const Clock& clock_;
-  Mutex writeMutex_;  // one writer of this process; taken before mutex_
+  Gate writing_;  // one writer of this process
+  // Until when a domain's lock that somebody keeps is waited for: by all who come, once.
+  std::map<std::string, MonotonicTime> lockDeadlines_ GUARDED_BY(writing_);
   Mutex mutex_;
   std::map<std::string, std::unique_ptr<FlatTomlFile>, std::less<>> domains_ GUARDED_BY(mutex_);
 };

@@ -11,6 +11,7 @@
 #include <atomic>
 #include <chrono>
 #include <fstream>
+#include <future>
 #include <regex>
 #include <string>
 #include <thread>
@@ -297,6 +298,39 @@ TEST_F(TomlEntitlementsTest, AsksOnceForAConnectionWhatItRuns) {
   self.pidfd = pidfdOf(::getpid());
   EXPECT_FALSE(entitlements.valueFor(self, kEntitlement).boolValue());
   EXPECT_EQ(refusing.asked, 1);
+}
+
+// As one that stands still and is waited for.
+class SlowInspector final : public ProgramInspector {
+ public:
+  std::variant<ProgramIdentity, int> runningProgram(int32_t) override {
+    asked.set_value();
+    EXPECT_EQ(answer.get_future().wait_for(std::chrono::seconds(60)), std::future_status::ready);
+    return ETIMEDOUT;
+  }
+  std::string programPath(int32_t) override { return {}; }
+  std::promise<void> asked, answer;
+};
+
+TEST_F(TomlEntitlementsTest, AQuestionAboutAProgramHoldsUpNobodyElse) {
+  grant("executable = \"" + std::filesystem::read_symlink("/proc/self/exe").string() + "\"\n", "a.toml");
+  grant("user = 1234\n", "b.toml");
+  SlowInspector slow;
+  TomlEntitlements entitlements({folder_.path(), ::geteuid()}, slow, log_, counters_, clock_);
+  std::thread asks([&] {
+    PeerCredentials self = peer(1);
+    self.pidfd = pidfdOf(::getpid());
+    EXPECT_TRUE(entitlements.valueFor(self, kEntitlement).isNull());
+  });
+  slow.asked.get_future().wait();
+  std::promise<bool> granted;
+  std::future<bool> isGranted = granted.get_future();
+  std::thread other([&] { granted.set_value(entitlements.valueFor(peer(1234), kEntitlement).boolValue()); });
+  EXPECT_EQ(isGranted.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+  slow.answer.set_value();
+  asks.join();
+  other.join();
+  EXPECT_TRUE(isGranted.get());
 }
 
 TEST_F(TomlEntitlementsTest, ATrueValueCountsMoreThanAFalseOne) {

@@ -8,10 +8,14 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <functional>
 #include <set>
+#include <thread>
 
 #include "platform/Limits.h"
+#include "platform/SerialQueue.h"
+#include "platform/WorkerPool.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "tests/support/ChildProcess.h"
@@ -267,6 +271,46 @@ TEST_F(TomlUserDefaultsTest, GivesUpWhenTheLockIsHeldForTooLong) {
   EXPECT_TRUE(defaults.value(kDomain, "uuid:a:b").isNull());
   ASSERT_EQ(::flock(held.get(), LOCK_UN), 0);
   EXPECT_EQ(defaults.set(kDomain, "a", Value(1)), std::nullopt);
+}
+
+// One after the other they waited five seconds each, on workers that counted as running, and other users' sessions with
+// them.
+TEST_F(TomlUserDefaultsTest, ALockThatSomebodyKeepsIsWaitedForOnceByAllAndHoldsUpNobodyElse) {
+  constexpr int kWriters = 12;
+  folder_.write("com.vantu.kytreporting.lock", "");
+  const FileHandle held(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
+  ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
+  auto defaults = make(std::chrono::seconds(2));
+  WorkerPoolOptions options;
+  options.runnable = 2;
+  WorkerPool pool(options);
+  std::atomic<int> finished{0}, finishedBefore{-1};
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  const auto begin = std::chrono::steady_clock::now();
+  for (int i = 0; i < kWriters; ++i) {
+    queues.push_back(SerialQueue::create("test.writer", pool));
+    queues.back()->async([&, i] {
+      EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:" + std::to_string(i), String("x")), "x");
+      ++finished;
+    });
+  }
+  queues.push_back(SerialQueue::create("test.bystander", pool));
+  queues.back()->async([&] { finishedBefore = finished.load(); });
+  ASSERT_TRUE(eventually([&] { return finished == kWriters && finishedBefore >= 0; }));
+  EXPECT_EQ(finishedBefore, 0) << "it ran while they waited";
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(12)) << "two seconds for each";
+  EXPECT_EQ(counters_.value(Reason::customIdentifierRefused), uint64_t{kWriters});
+  ASSERT_EQ(::flock(held.get(), LOCK_UN), 0);
+  EXPECT_EQ(defaults.set(kDomain, "a", Value(1)), std::nullopt) << "free again";
+  ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
+  std::thread releases([&] {
+    while (::access((folder_ / "waits").c_str(), F_OK) != 0) std::this_thread::yield();
+    ::flock(held.get(), LOCK_UN);
+  });
+  folder_.write("waits", "");
+  EXPECT_EQ(defaults.set(kDomain, "a", Value(2)), std::nullopt) << "waited for anew";
+  releases.join();
+  pool.shutDown();
 }
 
 TEST_F(TomlUserDefaultsTest, ACrashAtAnyStepLeavesTheOldOrTheNewContent) {
