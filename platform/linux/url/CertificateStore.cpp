@@ -1,43 +1,108 @@
 #include "platform/linux/url/CertificateStore.h"
 
+#include <fcntl.h>
+#include <openssl/bio.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
 #include <openssl/x509_vfy.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <memory>
+#include <string_view>
+#include <utility>
 
 namespace kyt {
+namespace {
+
+struct Free {
+  void operator()(X509_STORE* store) const { X509_STORE_free(store); }
+  void operator()(BIO* bio) const { BIO_free(bio); }
+  void operator()(STACK_OF(X509_INFO) * entries) const { sk_X509_INFO_pop_free(entries, X509_INFO_free); }
+};
+using Store = std::unique_ptr<X509_STORE, Free>;
+
+std::string fromEnvironment(const char* name, const char* otherwise) {
+  const char* value = std::getenv(name);
+  return value != nullptr ? value : otherwise;
+}
+
+std::vector<std::string> systemPlaces() {
+  std::vector<std::string> places = {
+      fromEnvironment(X509_get_default_cert_file_env(), X509_get_default_cert_file())};
+  const std::string folders = fromEnvironment(X509_get_default_cert_dir_env(), X509_get_default_cert_dir());
+  for (std::string_view rest = folders; !rest.empty();) {
+    const size_t end = std::min(rest.find(':'), rest.size());
+    places.emplace_back(rest.substr(0, end));
+    rest.remove_prefix(std::min(end + 1, rest.size()));
+  }
+  return places;
+}
+
+// All certificates and revocation lists of a PEM file; false when there is none, or one of them is broken.
+bool addFile(X509_STORE* store, const std::string& path) {
+  // Without O_NONBLOCK a named pipe in the file's place would hold the network thread for ever.
+  const int descriptor = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
+  if (descriptor < 0) return false;
+  const std::unique_ptr<BIO, Free> file(BIO_new_fd(descriptor, BIO_CLOSE));
+  struct stat status = {};
+  if (!file) return ::close(descriptor), false;
+  if (::fstat(descriptor, &status) != 0 || !S_ISREG(status.st_mode)) return false;
+  const std::unique_ptr<STACK_OF(X509_INFO), Free> entries(
+      PEM_X509_INFO_read_bio(file.get(), nullptr, nullptr, nullptr));
+  if (!entries) return false;
+  int added = 0;
+  for (int i = 0; i < sk_X509_INFO_num(entries.get()); ++i) {
+    const X509_INFO* entry = sk_X509_INFO_value(entries.get(), i);
+    if (entry->x509 != nullptr && X509_STORE_add_cert(store, entry->x509) != 1) return false;
+    if (entry->crl != nullptr && X509_STORE_add_crl(store, entry->crl) != 1) return false;
+    added += (entry->x509 != nullptr) + (entry->crl != nullptr);
+  }
+  return added > 0;
+}
+
+}  // namespace
+
+CertificateStore::CertificateStore(std::string file)
+    : file_(std::move(file)), watched_(file_.empty() ? systemPlaces() : std::vector<std::string>{file_}) {}
 
 CertificateStore::~CertificateStore() {
   X509_STORE_free(store_);
 }
 
-bool CertificateStore::load() {
-  struct stat now {};
-  if (!file_.empty()) {
-    if (stat(file_.c_str(), &now) != 0)
-      return store_ != nullptr;  // being replaced: what was read still holds
-    const bool unchanged = now.st_ino == read_.st_ino && now.st_size == read_.st_size &&
-                           now.st_ctim.tv_sec == read_.st_ctim.tv_sec &&
-                           now.st_ctim.tv_nsec == read_.st_ctim.tv_nsec;
-    if (store_ != nullptr && unchanged) return true;
-  } else if (store_ != nullptr) {
-    return true;
-  }
-  X509_STORE* fresh = X509_STORE_new();
-  if (fresh == nullptr) return store_ != nullptr;
-  const int good =
-      file_.empty() ? X509_STORE_set_default_paths(fresh) : X509_STORE_load_file(fresh, file_.c_str());
-  if (good != 1) {
-    X509_STORE_free(fresh);
-    return store_ != nullptr;
-  }
+CertificateStore::Seen CertificateStore::look(const std::string& path) {
+  struct stat status = {};
+  if (::stat(path.c_str(), &status) != 0) return {};
+  return {status.st_dev, status.st_ino, status.st_size, status.st_ctim.tv_sec, status.st_ctim.tv_nsec};
+}
+
+void CertificateStore::load() {
+  std::vector<Seen> now;
+  for (const std::string& path : watched_) now.push_back(look(path));
+  if (store_ != nullptr && now == read_) return;
+  Store fresh(X509_STORE_new());
+  if (!fresh) return;
+  const bool good =
+      file_.empty() ? X509_STORE_set_default_paths(fresh.get()) == 1 : addFile(fresh.get(), file_);
+  if (!good) return;  // being replaced, perhaps: what was read still holds
   // An administrator may trust an intermediate authority alone.
-  X509_STORE_set_flags(fresh, X509_V_FLAG_TRUSTED_FIRST | X509_V_FLAG_PARTIAL_CHAIN);
+  X509_STORE_set_flags(fresh.get(), X509_V_FLAG_TRUSTED_FIRST | X509_V_FLAG_PARTIAL_CHAIN);
   X509_STORE_free(store_);
-  store_ = fresh;
-  read_ = now;
-  return true;
+  store_ = fresh.release();
+  ++generation_;
+  read_ = std::move(now);
+}
+
+unsigned CertificateStore::generation() {
+  load();
+  return generation_;
 }
 
 x509_store_st* CertificateStore::store() {
-  return load() ? store_ : nullptr;
+  load();
+  return store_;
 }
 
 }  // namespace kyt

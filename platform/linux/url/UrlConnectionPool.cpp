@@ -1,5 +1,6 @@
 #include "platform/linux/url/UrlConnectionPool.h"
 
+#include <strings.h>
 #include <sys/epoll.h>
 #include <unistd.h>
 
@@ -98,11 +99,20 @@ CURL* URLConnectionPool::takeHandle() {
   return handle;
 }
 
+// A TLS session that is taken up again is not verified again, so none is once authorities have changed.
+bool URLConnectionPool::mayResume(const URLTransfer& transfer) {
+  if (strncasecmp(transfer.request.url.c_str(), "https:", 6) != 0) return true;
+  const unsigned generation = network_.certificates().generation();
+  if (!certificates_) certificates_ = generation;
+  return *certificates_ == generation;
+}
+
 CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
   if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
   transfer.pool = this;
   transfer.configure(handle);
+  curl_.easySetOption(handle, CURLOPT_SSL_SESSIONID_CACHE, mayResume(transfer) ? 1L : 0L);
   if (curl_.multiAdd(multi_, handle) != CURLM_OK) {
     transfer.pool = nullptr;
     curl_.easyCleanup(handle);

@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -55,6 +56,7 @@ class URLConnectionPool {
   static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
   static int timerChanged(CURLM* multi, long milliseconds, void* pool);
   [[nodiscard]] CURL* takeHandle();
+  [[nodiscard]] bool mayResume(const URLTransfer& transfer);
   void timerExpired();
   void finishEnded();
 
@@ -66,6 +68,7 @@ class URLConnectionPool {
   size_t active_ = 0;
   bool isRetired_ = false;
   std::vector<std::shared_ptr<URLConnection>> connections_;  // some of them never come to be
+  std::optional<unsigned> certificates_;  // their generation when a server was verified first
   std::vector<CURL*> idleHandles_;
   Deadline timer_;  // libcurl's
   Deadline idle_;

@@ -143,23 +143,38 @@ bool URLNetwork::stopWithin(Duration patience) {
     if (running_) eventfd_write(wake_, 1);
   }
   if (!thread.joinable()) return true;
+  {
+    MutexLock lock(mutex_);
+    while (!threadEnds_)
+      if (!changed_.waitUntil(mutex_, end) && !threadEnds_) {
+        thread_ = std::move(thread);  // it waits for a file whose file system never answers, say
+        return false;
+      }
+  }
   thread.join();
   {
-    std::unique_lock lock(mutex_.native());
-    (void)allDelivered_.wait_until(lock, end, [&] { return outstanding_.load() == 0; });
+    MutexLock lock(mutex_);
+    while (outstanding_.load() != 0 && changed_.waitUntil(mutex_, end)) {
+    }
   }
   return !workers_ || workers_->shutDownWithin(end - std::chrono::steady_clock::now());
 }
 
 void URLNetwork::stop() {
   static_cast<void>(stopWithin(kStopPatience));
+  std::thread thread;
+  {
+    MutexLock lock(mutex_);
+    thread = std::move(thread_);
+  }
+  if (thread.joinable()) thread.join();
   if (workers_) workers_->shutDown();
 }
 
 void URLNetwork::completionHasRun() {
   if (outstanding_.fetch_sub(1) != 1) return;
   MutexLock lock(mutex_);
-  allDelivered_.notify_all();
+  changed_.notifyAll();
 }
 
 URLFigures URLNetwork::figures() const {
@@ -206,6 +221,9 @@ void URLNetwork::run() {
     closePool(*session, 1);
   }
   if (curl_) curl_->globalCleanup();
+  MutexLock lock(mutex_);
+  threadEnds_ = true;
+  changed_.notifyAll();
 }
 
 void URLNetwork::handleEvent(uint64_t which, uint32_t events) {

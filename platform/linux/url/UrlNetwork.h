@@ -8,11 +8,11 @@
 #pragma once
 
 #include <atomic>
-#include <condition_variable>
 #include <memory>
 #include <thread>
 #include <vector>
 
+#include "platform/ConditionVariable.h"
 #include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
@@ -161,8 +161,9 @@ class URLNetwork {
   std::vector<Command> commands_ GUARDED_BY(mutex_);
   bool running_ GUARDED_BY(mutex_) = false;
   bool stopping_ GUARDED_BY(mutex_) = false;
+  bool threadEnds_ GUARDED_BY(mutex_) = false;  // nothing is left for it to do
   std::thread thread_ GUARDED_BY(mutex_);
-  std::condition_variable allDelivered_;
+  ConditionVariable changed_;  // the thread ends, or nothing is outstanding any more
 
   // The network thread's.
   MonotonicTime now_;

@@ -1,6 +1,12 @@
 #include <curl/curl.h>
+#include <openssl/pem.h>
+#include <openssl/x509.h>
+#include <sys/stat.h>
 
+#include <cstdio>
+#include <cstdlib>
 #include <filesystem>
+#include <memory>
 #include <set>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
@@ -90,6 +96,47 @@ TEST_F(CurlURLSessionTLS, TakesUpAReplacedCertificateFile) {
   std::filesystem::rename(authority_.folder() + "/next.pem", authority_.file());
   const Outcome outcome = perform(*urls, get(server.url("/")));
   EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+}
+
+TEST_F(CurlURLSessionTLS, ANamedPipeInTheCertificateFilesPlaceHoldsNobody) {
+  const std::string pipe = authority_.folder() + "/pipe.pem";
+  ASSERT_EQ(::mkfifo(pipe.c_str(), 0600), 0);
+  options_.certificateFile = pipe;
+  TestHTTPServer server(with(authority_.issue()));
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_SSL_CACERT_BADFILE);
+}
+
+// As `openssl rehash` names it: the hash of its subject.
+std::string hashedName(const std::string& file) {
+  const std::unique_ptr<FILE, int (*)(FILE*)> in(std::fopen(file.c_str(), "r"), std::fclose);
+  X509* certificate = PEM_read_X509(in.get(), nullptr, nullptr, nullptr);
+  char name[16];
+  std::snprintf(name, sizeof name, "%08lx.0", X509_subject_name_hash(certificate));
+  X509_free(certificate);
+  return name;
+}
+
+TEST_F(CurlURLSessionTLS, AnAuthorityThatTheSystemWithdrewIsNotTrustedAnyMore) {
+  const std::string folder = authority_.folder() + "/system";
+  std::filesystem::create_directory(folder);
+  const std::string file = folder + "/" + hashedName(authority_.file());
+  std::filesystem::copy_file(authority_.file(), file);
+  ::setenv("SSL_CERT_DIR", (authority_.folder() + "/none:" + folder).c_str(), 1);
+  options_.certificateFile.clear();
+  TestHTTPServer server(with(authority_.issue()));
+  server.setHandler([](const TestHTTPServer::Request&) {
+    TestHTTPServer::Reply reply;
+    reply.headers = {{"Connection", "close"}};
+    return reply;
+  });
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).status(), 200);
+  std::filesystem::remove(file);
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).errorCode(), CURLE_PEER_FAILED_VERIFICATION);
+  std::filesystem::copy_file(authority_.file(), file);
+  EXPECT_EQ(perform(*urls, get(server.url("/"))).status(), 200);
+  ::unsetenv("SSL_CERT_DIR");
 }
 
 TEST_F(CurlURLSessionTLS, FollowsFiveRedirectsThatStayOnHTTPSButNotASixth) {
