@@ -1,5 +1,7 @@
 #include "daemon/Daemon.h"
 
+#include <cmath>
+#include <csignal>
 #include <cstdlib>
 #include <memory>
 #include <utility>
@@ -97,8 +99,25 @@ std::unique_ptr<DeletionBroker> deletionBroker(const LinuxConfinement& confineme
   return std::move(std::get<std::unique_ptr<DeletionBroker>>(started));
 }
 
-int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspector& inspector,
-          const DeletionBroker* broker, Confinement& confinement, StopSignals& stopSignals) {
+// Past the grace time, for what has a limit of its own: what was cancelled, the threads, the helpers.
+std::chrono::seconds lastMoment(const Limits& limits) {
+  constexpr std::chrono::seconds kForTheRest{8};
+  return kForTheRest + std::chrono::seconds(static_cast<int64_t>(std::ceil(limits.shutdownGraceSeconds)));
+}
+
+int waitForTheEnd(StopSignals& signals, Log& log) {
+  for (;;) {
+    const int signal = signals.wait();
+    if (signal != SIGHUP) return signal;
+    log.normal(
+        "main: Signal 1 changes nothing: grants, user defaults, device properties and certificates are read whenever "
+        "they change, settings at the next start");
+  }
+}
+
+int serve(const Settings& settings, const Paths& paths, Log& log, Counters& counters,
+          ProgramInspector& inspector, const DeletionBroker* broker, Confinement& confinement,
+          StopSignals& stopSignals) {
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -115,13 +134,15 @@ int serve(const Settings& settings, const Paths& paths, Log& log, ProgramInspect
     log.error("main: Cannot start the reactor");
     return kCouldNotStart;
   }
-  DaemonServices services({settings, paths, log, inspector, broker, std::move(reactor), std::move(acceptor),
-                           activated, [&stopSignals] { stopSignals.request(); }});
+  log.allowThreads();
+  DaemonServices services({settings, paths, log, counters, inspector, broker, std::move(reactor),
+                           std::move(acceptor), activated, [&stopSignals] { stopSignals.request(); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
   static_cast<void>(giveBackCodePages());
-  const int signal = stopSignals.wait();
+  const int signal = waitForTheEnd(stopSignals, log);
+  endProcessAtTheLatest(lastMoment(settings.limits), 0);
   if (signal != 0)
     log.normal("main: Ending on signal %d", signal);
   else
@@ -145,7 +166,8 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
   const Settings& settings = std::get<Settings>(read);
-  const std::unique_ptr<LogSink> sink = makeLogSink(settings.logTarget);
+  Counters counters;
+  const std::unique_ptr<LogSink> sink = makeLogSink(settings.logTarget, counters);
   log.setSink(*sink);
   if (auto error = makeMissingFolders(paths)) {
     log.error("main: %s", error->c_str());
@@ -156,6 +178,10 @@ int runDaemon(const DaemonOptions& options) {
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
   StopSignals stopSignals;
+  if (stopSignals.error() != 0) {
+    log.error("main: Cannot wait for signals: %s", errorText(stopSignals.error()).c_str());
+    return kCouldNotStart;
+  }
   log.normal("startLogging: Daemon starts logging...");
   LinuxConfinement confinement = confinementOf(paths, settings);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
@@ -167,7 +193,7 @@ int runDaemon(const DaemonOptions& options) {
   logWhatIsNotEnforced(confinement, log);
   log.debug("main: At most %llu descriptors",
             static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
-  return serve(settings, paths, log, *inspector, broker.get(), confinement, stopSignals);
+  return serve(settings, paths, log, counters, *inspector, broker.get(), confinement, stopSignals);
 }
 
 }  // namespace kyt

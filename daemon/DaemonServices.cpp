@@ -90,6 +90,7 @@ class DaemonServices::Deadline {
 DaemonServices::DaemonServices(Start start)
     : settings_(start.settings),
       log_(start.log),
+      counters_(start.counters),
       idle_(std::move(start.idle)),
       reactor_(std::move(start.reactor)),
       workers_(workerPoolOptions(counters_, log_)),
@@ -161,6 +162,8 @@ bool DaemonServices::endWhenIdle() {
 
 bool DaemonServices::shutDown() {
   const Deadline deadline(clock_, settings_.limits.shutdownGraceSeconds);
+  // Where the system refuses threads the deadline holds all the same.
+  workers_.stopInsisting();
   listener_.stopAccepting();
   // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
   // monitor, which a download holds, and so that no session's end waits behind its own upload.
@@ -181,9 +184,19 @@ bool DaemonServices::shutDown() {
   return threadsEnd;
 }
 
+bool DaemonServices::sessionsEndWithin(const Deadline& deadline) {
+  constexpr Duration kRefusedThreadPause = std::chrono::milliseconds(50);
+  for (;;) {
+    const Duration left = deadline.left();
+    if (agent_.waitUntilSessionsHaveEnded(std::min(left, kRefusedThreadPause))) return true;
+    if (left <= Duration(0)) return false;
+    workers_.tryAgain();
+  }
+}
+
 void DaemonServices::endSessions(const Deadline& deadline) {
   agent_.finishAllSessions();
-  if (agent_.waitUntilSessionsHaveEnded(deadline.left())) return;
+  if (sessionsEndWithin(deadline)) return;
   log_.error("shutDown: Sessions have not ended in time, cancelling what they wait for");
   urlSessions_.cancelAll();
   listener_.invalidateConnections();

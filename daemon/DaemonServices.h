@@ -57,6 +57,7 @@ class DaemonServices {
     const Settings& settings;
     const Paths& paths;
     Log& log;
+    Counters& counters;
     ProgramInspector& inspector;
     const DeletionBroker* broker;  // null: uploaded files stay
     std::unique_ptr<EpollReactor> reactor;
@@ -82,14 +83,15 @@ class DaemonServices {
   [[nodiscard]] bool endWhenIdle();
   [[nodiscard]] bool isIdle() const;
   [[nodiscard]] bool isOutstanding() const;
+  [[nodiscard]] bool sessionsEndWithin(const Deadline& deadline);
   void endSessions(const Deadline& deadline);
   void waitForRequests(const Deadline& deadline);
   void logFigures();
 
   const Settings& settings_;
   Log& log_;
+  Counters& counters_;
   const std::function<void()> idle_;
-  Counters counters_;
   LinuxClock clock_;
   std::unique_ptr<EpollReactor> reactor_;
   WorkerPool workers_;

@@ -116,6 +116,8 @@ const char* reasonName(Reason reason) {
       return "bad-user-defaults-file";
     case Reason::badEntitlementsFile:
       return "bad-entitlements-file";
+    case Reason::logLineDropped:
+      return "log-line-dropped";
     case Reason::messageLogLineLost:
       return "message-log-line-lost";
     case Reason::valueNotPostable:

@@ -76,6 +76,7 @@ enum class Reason : uint8_t {
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
+  logLineDropped,       // nobody read standard error, and what may wait for that is full
   messageLogLineLost,   // no file could be made or written, or it is full
   valueNotPostable,     // a record's value removed because JSON cannot carry it
   fileNotRemoved,       // an uploaded file that the broker could not or would not remove

@@ -27,6 +27,8 @@ class LogSink {
  public:
   virtual ~LogSink() = default;
   virtual void write(LogLevel level, std::string_view line) = 0;
+  // Before this it starts no thread. Once, when the process is confined.
+  virtual void allowThreads() {}
 };
 
 class Log {
@@ -39,6 +41,7 @@ class Log {
   void setLevel(LogLevel level) { level_.store(static_cast<int>(level), std::memory_order_relaxed); }
   // Only before other threads exist.
   void setSink(LogSink& sink) { sink_ = &sink; }
+  void allowThreads() { sink_->allowThreads(); }
   [[nodiscard]] bool enabled(LogLevel level) const {
     return static_cast<int>(level) >= level_.load(std::memory_order_relaxed);
   }

@@ -56,6 +56,8 @@ class WorkerPool::Implementation {
 
   void submit(std::shared_ptr<SerialQueue> queue);
   bool shutDown(MonotonicTime end);
+  void stopInsisting();
+  void tryAgain();
   void block();
   void unblock();
   [[nodiscard]] bool borrow();
@@ -96,6 +98,7 @@ class WorkerPool::Implementation {
   uint64_t wakeUps_ GUARDED_BY(mutex_) = 0;
   size_t borrowed_ GUARDED_BY(mutex_) = 0;  // queues that threads of others run
   bool stopping_ GUARDED_BY(mutex_) = false;
+  bool insists_ GUARDED_BY(mutex_) = true;
   bool mustTell_ GUARDED_BY(mutex_) = false;  // that work waited; told by the next worker, without the lock
 };
 
@@ -109,7 +112,7 @@ void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
       const bool looksNext = Worker::current != nullptr && Worker::current->queue == queue.get();
       ready_.push_back(std::move(queue));
       if (!looksNext) toWake = workerToWake();
-      stranded = nobodyComes();
+      stranded = nobodyComes() && insists_;
     }
   }
   if (toWake != nullptr) toWake->wake.notifyOne();
@@ -129,13 +132,27 @@ void WorkerPool::Implementation::insistOnAWorker() {
     bool stranded = false;
     {
       MutexLock lock(mutex_);
-      if (stopping_) return;
+      if (stopping_ || !insists_) return;
       toWake = workerToWake();
       stranded = nobodyComes();
     }
     if (toWake != nullptr) toWake->wake.notifyOne();
     if (!stranded) return;
   }
+}
+
+void WorkerPool::Implementation::stopInsisting() {
+  MutexLock lock(mutex_);
+  insists_ = false;
+}
+
+void WorkerPool::Implementation::tryAgain() {
+  Worker* toWake = nullptr;
+  {
+    MutexLock lock(mutex_);
+    if (!stopping_) toWake = workerToWake();
+  }
+  if (toWake != nullptr) toWake->wake.notifyOne();
 }
 
 // Counts a sleeping worker as looking and returns it, or starts one, if work waits that no worker would see
@@ -365,6 +382,12 @@ bool WorkerPool::borrow() {
 }
 void WorkerPool::giveBack() {
   implementation_->giveBack();
+}
+void WorkerPool::stopInsisting() {
+  implementation_->stopInsisting();
+}
+void WorkerPool::tryAgain() {
+  implementation_->tryAgain();
 }
 void WorkerPool::shutDown() {
   static_cast<void>(implementation_->shutDown(MonotonicTime::max()));

@@ -45,6 +45,10 @@ class WorkerPool final : public Executor {
   void submit(std::shared_ptr<SerialQueue> queue) override;
   [[nodiscard]] bool borrow() override;
   void giveBack() override;
+  // From now on whoever submits does not wait for a thread that the system refuses: what is ready waits until
+  // tryAgain(), which the caller then owes, or the next submission finds one.
+  void stopInsisting();
+  void tryAgain();
   // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a
   // worker.
   void shutDown();

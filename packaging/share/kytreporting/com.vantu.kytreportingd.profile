@@ -93,8 +93,8 @@ allow = [
   "set_robust_list", "rseq", "exit", "exit_group", "sched_getaffinity",
   "prctl(PR_SET_NAME)", "prctl(PR_GET_NAME)", "prctl(PR_SET_VMA)",
   "wait4",                            # the helper processes' end, when the daemon ends
-  # Signals: handling them, and raising one in itself (abort)
-  "rt_sigaction", "rt_sigprocmask", "rt_sigreturn", "tgkill(SELF)",
+  # Signals: handling them, raising one in itself (abort), and the last net under the end (see THREADS)
+  "rt_sigaction", "rt_sigprocmask", "rt_sigreturn", "tgkill(SELF)", "setitimer(ITIMER_REAL)",
   # The clock, where the kernel does not answer without a call
   "clock_gettime", "clock_getres", "gettimeofday", "time",
   # What this process and this machine are, and what it may have (not changing it)

@@ -25,7 +25,9 @@ struct Capabilities {
 // A kernel answers EINVAL for capabilities that it does not know.
 int emptyBoundingSet() {
   for (int capability = 0; capability < kMostCapabilities; ++capability) {
-    if (::prctl(PR_CAPBSET_READ, capability, 0, 0, 0) != 1) continue;
+    const int held = ::prctl(PR_CAPBSET_READ, capability, 0, 0, 0);
+    if (held < 0 && errno != EINVAL) return errno;
+    if (held != 1) continue;
     if (::prctl(PR_CAPBSET_DROP, capability, 0, 0, 0) != 0) return errno;
   }
   return 0;

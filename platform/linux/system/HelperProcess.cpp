@@ -17,6 +17,7 @@ namespace {
 void leaveTheDaemon(const char* name, int socket) {
   // A terminal's Ctrl-C reaches this process too; it ends with the daemon and not before.
   for (const int ignored : {SIGINT, SIGTERM, SIGHUP, SIGPIPE}) ::signal(ignored, SIG_IGN);
+  ::signal(SIGALRM, SIG_DFL);  // ends what a child of it does for too long
   ::prctl(PR_SET_NAME, name);
   ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
   ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);

@@ -22,6 +22,17 @@ char priority(LogLevel level) {
   return '3';
 }
 
+std::string textOfLine(LogLevel level, std::string_view line) {
+  std::string text;
+  text.reserve(line.size() + 8);
+  text += '<';
+  text += priority(level);
+  text += '>';
+  appendEscaped(text, line);
+  text += '\n';
+  return text;
+}
+
 constexpr size_t kLongestOperation = 128;
 
 iovec field(const std::string& text) {
@@ -31,14 +42,19 @@ iovec field(const std::string& text) {
 }  // namespace
 
 void StderrSink::write(LogLevel level, std::string_view line) {
-  std::string text;
-  text.reserve(line.size() + 8);
-  text += '<';
-  text += priority(level);
-  text += '>';
-  appendEscaped(text, line);
-  text += '\n';
-  (void)writeAll(fd_, text);
+  (void)writeAll(fd_, textOfLine(level, line));
+}
+
+PatientStderrSink::PatientStderrSink(Counters& counters, int fd, size_t maxQueuedBytes)
+    : lines_(fd, LineWriterOptions{maxQueuedBytes, [&counters] { counters.add(Reason::logLineDropped); },
+                                   [](unsigned long long count) {
+                                     return textOfLine(LogLevel::error,
+                                                       "log: " + std::to_string(count) +
+                                                           " lines were dropped, since nobody read them");
+                                   }}) {}
+
+void PatientStderrSink::write(LogLevel level, std::string_view line) {
+  lines_.write(textOfLine(level, line));
 }
 
 bool JournalSink::isAvailable() {
@@ -46,7 +62,7 @@ bool JournalSink::isAvailable() {
   return ::stat("/run/systemd/journal/socket", &status) == 0 && S_ISSOCK(status.st_mode);
 }
 
-std::unique_ptr<JournalSink> JournalSink::open(std::string identifier) {
+std::unique_ptr<JournalSink> JournalSink::open(Counters& counters, std::string identifier) {
   const auto loaded = SystemdLibrary::load();
   if (const auto* problem = std::get_if<std::string>(&loaded)) {
     StderrSink().write(LogLevel::error, "JournalSink(open): no journal: " + *problem);
@@ -54,7 +70,7 @@ std::unique_ptr<JournalSink> JournalSink::open(std::string identifier) {
   }
   // The function that takes no place in the source: it would be the same for every line.
   Send* const send = std::get<SystemdLibrary>(loaded).journalSend;
-  return std::unique_ptr<JournalSink>(new JournalSink(send, std::move(identifier)));
+  return std::unique_ptr<JournalSink>(new JournalSink(send, counters, std::move(identifier)));
 }
 
 void JournalSink::write(LogLevel level, std::string_view line) {
@@ -69,12 +85,12 @@ void JournalSink::write(LogLevel level, std::string_view line) {
   if (send_(fields, 4) < 0) fallback_.write(level, line);
 }
 
-std::unique_ptr<LogSink> makeLogSink(LogTarget target) {
+std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters) {
   // Without its socket libsystemd would report success and drop every line.
   if (target != LogTarget::standardError && JournalSink::isAvailable()) {
-    if (auto journal = JournalSink::open()) return journal;
+    if (auto journal = JournalSink::open(counters)) return journal;
   }
-  return std::make_unique<StderrSink>();
+  return std::make_unique<PatientStderrSink>(counters);
 }
 
 }  // namespace kyt

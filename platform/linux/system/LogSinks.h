@@ -7,8 +7,11 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Counters.h"
+#include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Settings.h"
+#include "platform/linux/base/LineWriter.h"
 
 struct iovec;
 
@@ -24,25 +27,41 @@ class StderrSink final : public LogSink {
   const int fd_;
 };
 
+// The same for a daemon, which must not wait for whoever reads its log: lines that find no room wait in a queue
+// (LineWriter.h), and what finds none there is counted as Reason::logLineDropped.
+class PatientStderrSink final : public LogSink {
+ public:
+  explicit PatientStderrSink(Counters& counters, int fd = 2,
+                             size_t maxQueuedBytes = Limits::maxQueuedLogBytes);
+  void write(LogLevel level, std::string_view line) override;
+  void allowThreads() override { lines_.allowThread(); }
+
+ private:
+  LineWriter lines_;
+};
+
 // Entries with MESSAGE, PRIORITY (7, 6, 3), SYSLOG_IDENTIFIER and KYT_OPERATION (what stands before the first
 // colon). What the journal does not take goes to standard error.
 class JournalSink final : public LogSink {
  public:
   // None where libsystemd is missing; why is written to standard error.
-  [[nodiscard]] static std::unique_ptr<JournalSink> open(std::string identifier = "kytreportingd");
+  [[nodiscard]] static std::unique_ptr<JournalSink> open(Counters& counters,
+                                                         std::string identifier = "kytreportingd");
   void write(LogLevel level, std::string_view line) override;
+  void allowThreads() override { fallback_.allowThreads(); }
   // Whether the journal's socket is there.
   [[nodiscard]] static bool isAvailable();
 
  private:
   using Send = int(const iovec*, int);
-  JournalSink(Send* send, std::string identifier) : send_(send), identifier_(std::move(identifier)) {}
+  JournalSink(Send* send, Counters& counters, std::string identifier)
+      : send_(send), identifier_(std::move(identifier)), fallback_(counters) {}
   Send* const send_;  // sd_journal_sendv
   const std::string identifier_;
-  StderrSink fallback_;
+  PatientStderrSink fallback_;
 };
 
 // The journal when its socket is there and standard error was not asked for.
-[[nodiscard]] std::unique_ptr<LogSink> makeLogSink(LogTarget target);
+[[nodiscard]] std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters);
 
 }  // namespace kyt

@@ -13,6 +13,7 @@
 #include <sys/mman.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
+#include <sys/time.h>
 
 #include <cstdint>
 #include <string_view>
@@ -109,6 +110,7 @@ inline constexpr SystemCallConstant kSystemCallConstants[] = {
     KYT_CONSTANT(CLONE_NEWPID),
     KYT_CONSTANT(CLONE_NEWUSER),
     KYT_CONSTANT(CLONE_NEWUTS),
+    KYT_CONSTANT(ITIMER_REAL),
     KYT_CONSTANT(PR_SET_NAME),
     KYT_CONSTANT(PR_GET_NAME),
     {"PR_SET_VMA", 0x53564d41},  // the allocator names its memory; younger than some headers

@@ -1,0 +1,79 @@
+// A daemon in which a call that the test names fails.
+#pragma once
+
+#include <fcntl.h>
+#include <stdlib.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <string>
+#include <string_view>
+#include <utility>
+
+#include "tests/integration/DaemonProcess.h"
+#include "tests/support/Sanitizers.h"
+#include "tests/support/failing/FailingCalls.h"
+
+namespace kyt {
+
+class FailingDaemon : public DaemonProcess {
+ public:
+  static constexpr int kAlways = 1 << 30;
+
+  explicit FailingDaemon(const std::string& storebags) : DaemonProcess(storebags) {
+    const std::string path = root().write("failing", std::string(sizeof(kyt_failing_control), '\0'));
+    const int file = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
+    void* mapped = ::mmap(nullptr, sizeof(kyt_failing_control), PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
+    ::close(file);
+    if (mapped == MAP_FAILED) std::abort();
+    control_ = static_cast<kyt_failing_control*>(mapped);
+    path_ = path;
+    addBeforeExecution([] {});
+    root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml", "consent = true\n");
+  }
+  ~FailingDaemon() { ::munmap(control_, sizeof *control_); }
+
+  // Besides what loads the library of failing calls.
+  void addBeforeExecution(std::function<void()> work) {
+    setBeforeExecution([path = path_, work = std::move(work)] {
+      ::setenv("KYT_FAILING_CALLS", path.c_str(), 1);
+      ::setenv("LD_PRELOAD", KYT_FAILING_LIBRARY, 1);
+      work();
+    });
+  }
+  [[nodiscard]] int threadsNamed(std::string_view name) const {
+    int count = 0;
+    std::error_code ended;
+    for (const auto& thread :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(process()) + "/task", ended)) {
+      std::string text;
+      std::ifstream(thread.path() / "comm") >> text;
+      count += text.starts_with(name) ? 1 : 0;
+    }
+    return count;
+  }
+  [[nodiscard]] int threads() const { return threadsNamed(""); }
+
+  // From now on the calls from the `first` one on fail, `times` of them.
+  void fail(kyt_failing_call call, int error, int first = 1, int times = 1) {
+    stopFailing();
+    control_->call = call;
+    control_->error = error;
+    control_->first = first;
+    control_->times = times;
+    control_->seen = control_->failed = 0;
+    __atomic_store_n(&control_->armed, 1, __ATOMIC_RELEASE);
+  }
+  void stopFailing() { __atomic_store_n(&control_->armed, 0, __ATOMIC_RELEASE); }
+  [[nodiscard]] int failures() const { return __atomic_load_n(&control_->failed, __ATOMIC_RELAXED); }
+
+ private:
+  std::string path_;
+  kyt_failing_control* control_;
+};
+
+}  // namespace kyt
