@@ -37,18 +37,24 @@ constexpr uint32_t kPrivateFolder = 0750;  // identifiers, and what was sent
 // The folders that the daemon writes to, which the confinement names, so they must exist before it.
 std::optional<std::string> makeMissingFolders(const Paths& paths) {
   if (auto error = makeFolders(paths.run(), kPublicFolder)) return error;
-  for (const std::string& folder : {paths.userDefaults(), paths.messageLogs()})
-    if (auto error = makeFolders(folder, kPrivateFolder)) return error;
-  return std::nullopt;
+  return makeFolders(paths.userDefaults(), kPrivateFolder);
 }
 
-LinuxConfinement confinementOf(const Paths& paths, const Settings& settings) {
+// Without it the daemon serves all the same: each line of the message log says what is wrong. Empty: no folder.
+std::string messageLogFolder(const Paths& paths, Log& log) {
+  const auto error = makeFolders(paths.messageLogs(), kPrivateFolder);
+  if (!error) return paths.messageLogs();
+  log.error("main: No message log: %s", error->c_str());
+  return {};
+}
+
+LinuxConfinement confinementOf(const Paths& paths, const Settings& settings, const std::string& messageLogs) {
   return LinuxConfinement(paths.kytShare(),
                           {{"CONFIG", paths.configuration()},
                            {"SHARE", paths.kytShare()},
                            {"PLUGINS", paths.plugIns()},
                            {"STATE", paths.userDefaults()},
-                           {"LOGS", paths.messageLogs()},
+                           {"LOGS", messageLogs},
                            {"RUN", paths.run()},
                            {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
 }
@@ -174,6 +180,8 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
 
+  const std::string messageLogs = messageLogFolder(paths, log);
+
   giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
@@ -183,7 +191,7 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
   log.normal("startLogging: Daemon starts logging...");
-  LinuxConfinement confinement = confinementOf(paths, settings);
+  LinuxConfinement confinement = confinementOf(paths, settings, messageLogs);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   if (const auto error = confine(confinement)) {

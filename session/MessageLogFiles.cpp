@@ -63,11 +63,7 @@ void MessageLogFiles::writeToLogFile(const char* format, std::initializer_list<V
   if (!file) return lineIsLost();
   const std::string line =
       formatObjects("(%@) ", {Date{now()}}) + escapedLines(formatObjects(format, objects)) + "\n";
-  if (file->size + line.size() > Limits::maxMessageLogBytes) {
-    if (counters_.addAndMayLog(Reason::messageLogLineLost, clock_.monotonic()))
-      log_.error("writeToLogFile: %s is full, lines are lost until it expires", file->path.c_str());
-    return;
-  }
+  if (file->size + line.size() > Limits::maxMessageLogBytes && !beginNext(*file, line.size())) return;
   if (const std::optional<Error> error = files_.append(file->path, line)) {
     log_.error("writeToLogFile: Error writing to log file %s: %s", file->path.c_str(),
                error->localizedDescription.c_str());
@@ -75,6 +71,21 @@ void MessageLogFiles::writeToLogFile(const char* format, std::initializer_list<V
     return lineIsLost();
   }
   log_.normal("writeToLogFile: Saved log message to %s", file->path.c_str());
+}
+
+// A full file gives way to the next one; there is one a second at most.
+bool MessageLogFiles::beginNext(File& full, size_t wanted) {
+  if (wanted <= Limits::maxMessageLogBytes) {
+    std::optional<File> next = newFile();
+    if (next && next->path != full.path) {
+      deleteFile(full);
+      full = std::move(*next);
+      return true;
+    }
+  }
+  if (counters_.addAndMayLog(Reason::messageLogLineLost, clock_.monotonic()))
+    log_.error("writeToLogFile: %s is full, lines are lost until the next can be begun", full.path.c_str());
+  return false;
 }
 
 std::vector<std::string> MessageLogFiles::listing() {

@@ -1,5 +1,5 @@
 // The local message log as files: one line for each call, in a file that is current for a day after its
-// creation and then deleted by the next call. At most one file stays; every call lists the folder, so this is
+// creation and then deleted by the next call, or by the one that finds it full. At most one file stays; every call lists the folder, so this is
 // for a low rate of lines. Files of other names in the folder are left alone.
 //
 // Takes no lock: each call opens, appends and closes within itself, and a line is appended in one piece, so
@@ -38,6 +38,8 @@ class MessageLogFiles final : public MessageLog {
   [[nodiscard]] std::vector<std::string> listing();
   [[nodiscard]] std::optional<File> currentFile();
   [[nodiscard]] std::optional<File> newFile();
+  // False: the line is lost, which has been counted.
+  [[nodiscard]] bool beginNext(File& full, size_t wanted);
   void deleteFile(const File& file);
   void lineIsLost();
   [[nodiscard]] double now() const;

@@ -8,6 +8,7 @@
 #include <chrono>
 #include <cstdio>
 #include <filesystem>
+#include <fstream>
 #include <memory>
 #include <string>
 #include <vector>
@@ -99,6 +100,23 @@ TEST_F(Daemon, MakesItsMissingFolders) {
   EXPECT_EQ(mode("run/kytreportingd"), std::filesystem::perms{0755});
   EXPECT_EQ(mode("var/lib/kytreportingd/defaults"), std::filesystem::perms{0750});
   EXPECT_EQ(mode("var/mobile/Library/Logs/Faultbin/Retired"), std::filesystem::perms{0750});
+}
+
+TEST_F(Daemon, ServesWithoutTheFolderOfTheMessageLog) {
+  const std::string folder = daemon_.root() / "var/mobile/Library/Logs/Faultbin/Retired";
+  for (const char* inItsPlace : {"Retired", "../Faultbin"}) {
+    const std::string place = std::filesystem::path(folder + "/../" + inItsPlace).lexically_normal();
+    std::filesystem::remove_all(place);
+    std::filesystem::create_directories(std::filesystem::path(place).parent_path());
+    std::ofstream(place) << "no folder";
+    serve();
+    ASSERT_TRUE(daemon_.startAndWait()) << daemon_.log();
+    EXPECT_TRUE(daemon_.logged("<3>main: No message log: ")) << daemon_.log();
+    const auto client = open();
+    EXPECT_TRUE(configure(*client));
+    daemon_.terminate();
+    EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  }
 }
 
 TEST_F(Daemon, EndsOnSIGINTToo) {

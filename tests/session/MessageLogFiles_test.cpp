@@ -231,19 +231,36 @@ TEST_F(MessageLogFilesTest, AFileThatCannotBeDeletedIsNotSaidToBe) {
   EXPECT_EQ(contents().at(logFile("1769860800")), line("text"));
 }
 
-TEST_F(MessageLogFilesTest, AFullFileTakesNoMoreUntilItExpires) {
+TEST_F(MessageLogFilesTest, AFullFileGivesWayToTheNext) {
   put(logFile("1"), 10, std::string(Limits::maxMessageLogBytes - line("fits").size(), '.'));
   write("fits");
   EXPECT_EQ(contents().at(logFile("1")).size(), Limits::maxMessageLogBytes);
+  write("next");
+  EXPECT_EQ(contents(), (std::map<std::string, std::string>{{logFile("1769860800"), line("next")}}));
+  EXPECT_TRUE(
+      logged(LogLevel::normal, "writeToLogFile: Deleted expired kytreportingd log file " + logFile("1")));
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 0U);
+}
+
+TEST_F(MessageLogFilesTest, AFileThatIsFullWithinItsSecondTakesNoMore) {
+  put(logFile("1769860800"), 0, std::string(Limits::maxMessageLogBytes, '.'));
   write("no more");
   write("no more");
-  EXPECT_EQ(contents().at(logFile("1")).size(), Limits::maxMessageLogBytes);
+  EXPECT_EQ(contents().at(logFile("1769860800")).size(), Limits::maxMessageLogBytes);
   EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 2U);
-  EXPECT_EQ(sink_.count(LogLevel::error, "writeToLogFile: " + logFile("1") + " is full"), 1U);
-  clock_.advance(std::chrono::hours(24));
+  EXPECT_EQ(sink_.count(LogLevel::error, "writeToLogFile: " + logFile("1769860800") + " is full"), 1U);
+  clock_.advance(std::chrono::seconds(1));
   write("next");
   EXPECT_EQ(contents().size(), 1U);
-  EXPECT_EQ(contents().begin()->first, logFile("1769947200"));
+  EXPECT_EQ(contents().begin()->first, logFile("1769860801"));
+}
+
+TEST_F(MessageLogFilesTest, AFullFileStaysWhenTheNextCannotBeMade) {
+  put(logFile("1"), 10, std::string(Limits::maxMessageLogBytes, '.'));
+  files_.setFaults({.createFile = true});
+  write("lost");
+  EXPECT_EQ(contents().size(), 1U);
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 1U);
 }
 
 TEST_F(MessageLogFilesTest, KeepsLineBreaksAndEscapesOtherControlCharacters) {
