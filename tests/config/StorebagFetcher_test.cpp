@@ -166,6 +166,10 @@ TEST_F(StorebagFetcherTest, LoadsTheBuiltInBagForOneFamily) {
   EXPECT_EQ(version_, String("1.0.0-Cadmor-Fallback"));
   EXPECT_TRUE(
       test_.sink.contains(LogLevel::normal, "fetchStorebagWithName: Loading default storebag 'cadmor'"));
+  EXPECT_TRUE(
+      test_.sink.contains(LogLevel::normal,
+                          "fetchStorebagWithName: For 3600 seconds it replaces the last good one: client "
+                          "types 7, 11, 13 and 20 post nothing"));
 }
 
 TEST_F(StorebagFetcherTest, UsesTheBuiltInReleaseSectionInTheSeedEnvironment) {
