@@ -22,6 +22,7 @@ WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log) {
   options.log = &log;
   options.maxWorkers = Limits::maxWorkers;
   options.nameThread = beginServiceThread;
+  options.whenQuiet = giveFreeMemoryBack;
   return options;
 }
 

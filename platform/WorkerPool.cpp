@@ -69,6 +69,7 @@ class WorkerPool::Implementation {
 
   void work(Worker& self);
   bool sleep(Worker& self) REQUIRES(mutex_);
+  bool hasWorkAfterQuiet() REQUIRES(mutex_);
   std::shared_ptr<SerialQueue> take(Worker& self) REQUIRES(mutex_);
   void release(Worker& self) REQUIRES(mutex_);
   void countExhausted() REQUIRES(mutex_);
@@ -211,8 +212,8 @@ void WorkerPool::Implementation::work(Worker& self) {
     std::shared_ptr<SerialQueue> queue;
     if (!stopping_ && running_ <= options_.runnable) queue = take(self);
     if (!queue) {
-      if (!sleep(self)) break;
-      continue;
+      if (sleep(self) || hasWorkAfterQuiet()) continue;
+      break;
     }
     --looking_;
     Worker* next = workerToWake();
@@ -248,6 +249,18 @@ bool WorkerPool::Implementation::sleep(Worker& self) {
       idle_.erase(std::find(idle_.begin(), idle_.end(), &self));
       return false;
     }
+  return true;
+}
+
+// The last worker's, at its end. Work that came meanwhile may have found no thread, and counted on this one.
+bool WorkerPool::Implementation::hasWorkAfterQuiet() {
+  if (workers_ != 1 || stopping_ || options_.whenQuiet == nullptr) return false;
+  mutex_.unlock();
+  options_.whenQuiet();
+  mutex_.lock();
+  if (workers_ != 1 || stopping_ || ready_.empty()) return false;
+  ++running_;
+  ++looking_;
   return true;
 }
 

@@ -29,8 +29,9 @@ struct WorkerPoolOptions {
   Duration idleExit = std::chrono::seconds(10);
   const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
   void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
-  Counters* counters = nullptr;  // Reason::workersExhausted, each time a queue must wait for a limit
-  Log* log = nullptr;            // with `counters`: a line about that, at most once a minute
+  void (*whenQuiet)() = nullptr;  // called by the last worker when it ends for want of work, no lock held
+  Counters* counters = nullptr;   // Reason::workersExhausted, each time a queue must wait for a limit
+  Log* log = nullptr;             // with `counters`: a line about that, at most once a minute
 };
 
 struct WorkerPoolFigures {

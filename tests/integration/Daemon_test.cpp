@@ -264,6 +264,32 @@ TEST_F(Daemon, EndsThousandsOfSessionsWithinTheGrace) {
   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
 }
 
+TEST_F(Daemon, GivesTheMemoryOfABusyTimeBackWhenItIsQuiet) {
+  if (kSanitized) GTEST_SKIP() << "a sanitizer's allocator is another";
+  serve();
+  ASSERT_TRUE(daemon_.startAndWait());
+  const auto report = [this](int sessions) {
+    std::vector<std::unique_ptr<KYTReporting>> clients;
+    for (int i = 0; i < sessions; ++i) {
+      clients.push_back(open());
+      EXPECT_TRUE(configure(*clients.back()));
+      for (int event = 0; event < 400; ++event)
+        EXPECT_TRUE(clients.back()->sendMessage(
+            10, 1,
+            Dictionary{{"text", std::string(1000, 'a')}, {"number", event}, {"list", Array{1, 2, 3}}}));
+    }
+    for (const auto& client : clients) EXPECT_TRUE(client->finish(std::chrono::seconds(20)));
+    return daemon_.anonymousKiB();
+  };
+  static_cast<void>(report(1));  // what is loaded once
+  ASSERT_TRUE(eventually([&] { return posts() > 0; }));
+  const long before = daemon_.anonymousKiB();
+  const long busy = report(100);
+  ASSERT_GT(busy, before + 20000);
+  EXPECT_TRUE(eventually([&] { return daemon_.anonymousKiB() < before + 6000; }))
+      << daemon_.anonymousKiB() << " KiB after " << busy << ", and " << before << " before";
+}
+
 TEST_F(Daemon, ASlowServerIsWaitedForUntilTheDeadline) {
   serve();
   daemon_.writeSettings("[storebag]\ninternal_host = \"" + server_.url("") + "\"\npublic_host = \"" +

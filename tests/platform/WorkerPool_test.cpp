@@ -49,6 +49,45 @@ TEST(WorkerPool, RunsWorkOnAThreadOfItsOwn) {
   EXPECT_NE(ranOn, std::this_thread::get_id());
 }
 
+std::atomic<int> timesQuiet{0};
+
+TEST(WorkerPool, SaysWhenItIsQuiet) {
+  WorkerPoolOptions o = options(2);
+  o.idleExit = std::chrono::milliseconds(20);
+  o.whenQuiet = [] { ++timesQuiet; };
+  timesQuiet = 0;
+  WorkerPool pool(o);
+  auto queue = SerialQueue::create("test", pool);
+  for (int round = 1; round <= 3; ++round) {
+    Semaphore done;
+    queue->async([&] { done.signal(); });
+    ASSERT_TRUE(done.waitFor(kDeadline));
+    EXPECT_TRUE(eventually([&] { return timesQuiet == round && pool.figures().workers == 0; }));
+  }
+}
+
+// Work that comes while the last worker says so is done, also where the system refuses another.
+TEST(WorkerPool, WorkThatComesWhileItGetsQuietIsDone) {
+  static Semaphore quiet, goOn;
+  WorkerPoolOptions o = options(2);
+  o.maxWorkers = 1;
+  o.idleExit = std::chrono::milliseconds(20);
+  o.whenQuiet = [] {
+    quiet.signal();
+    goOn.wait();
+  };
+  WorkerPool pool(o);
+  auto queue = SerialQueue::create("test", pool);
+  Semaphore done;
+  queue->async([&] { done.signal(); });
+  ASSERT_TRUE(done.waitFor(kDeadline));
+  ASSERT_TRUE(quiet.waitFor(kDeadline));
+  queue->async([&] { done.signal(); });
+  goOn.signal();
+  EXPECT_TRUE(done.waitFor(kDeadline));
+  goOn.signal();  // for the end
+}
+
 // A pool whose workers have all ended, and a system that refuses a new one for a while.
 TEST(WorkerPool, WorkThatFoundNoThreadRunsAsSoonAsThereIsOne) {
   if (kSanitized) GTEST_SKIP() << "a sanitizer takes more address space than any limit";

@@ -43,4 +43,8 @@ void giveLargeBlocksBack() {
   (void)::mallopt(M_MMAP_THRESHOLD, kLarge);
 }
 
+void giveFreeMemoryBack() {
+  (void)::malloc_trim(0);
+}
+
 }  // namespace kyt

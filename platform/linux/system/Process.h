@@ -19,5 +19,8 @@ void fillStandardDescriptors();
 // Large blocks (a file that is uploaded, a server's long reply) go back to the system when they are freed. Left to
 // itself the allocator keeps more and more of them, for each of its threads, after the first few.
 void giveLargeBlocksBack();
+// All free memory that the allocator keeps goes back to the system: for a moment of quiet, since it looks through all of
+// it. Any thread.
+void giveFreeMemoryBack();
 
 }  // namespace kyt
