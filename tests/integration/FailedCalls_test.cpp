@@ -12,6 +12,7 @@
 #include <csignal>
 #include <filesystem>
 #include <memory>
+#include <ostream>
 #include <string>
 
 #include "tests/integration/FailingDaemon.h"
@@ -36,6 +37,10 @@ struct Failure {
   int error;
   const char* errorName;
 };
+
+void PrintTo(const Failure& failure, std::ostream* out) {
+  *out << failure.name << " " << failure.errorName;
+}
 
 #define KYT_FAILURE(call, error)             \
   Failure {                                  \
@@ -208,7 +213,7 @@ TEST_P(FailedCalls, WhileItServesCostThatMomentAtMost) {
 }
 
 TEST_P(FailedCalls, AtTheEndDoNotKeepItFromEnding) {
-  withEachOfTheFirst([this](FailingDaemon& daemon, int first) {
+  withEachOfTheFirst([](FailingDaemon& daemon, int first) {
     ASSERT_TRUE(startsOrEnds(daemon)) << daemon.log();
     TestClient client(daemon.socketPath(), kBefore);
     ASSERT_EQ(client.configure(), "live: httppost") << daemon.log();

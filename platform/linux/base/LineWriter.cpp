@@ -137,8 +137,8 @@ void LineWriter::allowThread() {
 }
 
 void LineWriter::write(std::string line) {
-  MutexLock lock(state_->mutex);
   State& state = *state_;
+  MutexLock lock(state.mutex);
   state.put(std::move(line));
   if (state.draining) return;
   state.flush();
