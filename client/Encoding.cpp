@@ -88,38 +88,18 @@ bool Session::encodeMessage(const Item& item) {
   return writer.end();
 }
 
-bool Session::encodeSessionInfo() {
+bool Session::encodeSessionInfo(const std::optional<Dictionary>& userInfo) {
   MessageWriter writer(out_, kMaxCallBytes);
   MessageWriter::Call call;
   call.member = "SetSessionInfo";
   call.signature = "a{sv}aa{sv}avb";
   call.expectsReply = false;
   writer.beginCall(++serial_, call);
-  writer.writeDictionary(sessionInfo_);
-  writer.writeOptionalDictionary(userInfo_);
-  writer.writeOptionalValue(frameworks_);
+  writer.writeDictionary(kept_.sessionInfo);
+  writer.writeOptionalDictionary(userInfo);
+  writer.writeOptionalValue(kept_.frameworks);
   writer.writeBoolean(static_cast<bool>(aggregationBlock_));
   return writer.end();
-}
-
-void Session::replay() {
-  if (single_) return;
-  if (!encodeSessionInfo()) droppedInvalid_.fetch_add(1);
-  const auto again = [this](Kind kind, auto&& fill) {
-    auto command = std::make_unique<Command>(kind);
-    fill(*command);
-    const uint32_t serial = ++serial_;
-    if (encodeCommand(*command, serial)) pending_.push_back({serial, std::move(command)});
-  };
-  if (configured_) again(Kind::startConfiguration, [](Command&) {});
-  if (!sharedData_.empty())
-    again(Kind::updateSharedData, [this](Command& command) { command.dictionary = sharedData_; });
-  if (digestKey_) {
-    again(Kind::setDigestKey, [this](Command& command) {
-      command.data = *digestKey_;
-      command.algorithm = digestAlgorithm_;
-    });
-  }
 }
 
 bool Session::encodeCommand(Command& command, uint32_t serial) {
@@ -140,25 +120,17 @@ bool Session::encodeCommand(Command& command, uint32_t serial) {
       break;
     case Kind::fetchStates:
       writer.writeOptionalDictionary(command.dictionary);
-      if (command.dictionary) userInfo_ = command.dictionary;
       break;
     case Kind::updateSharedData:
       writer.writeDictionary(*command.dictionary);
-      sharedData_.merge(*command.dictionary);
       break;
     case Kind::updateSharedDataForKey:
       writer.writeString(command.text);
       writer.writeOptionalValue(command.value);
-      if (command.value.isNull())
-        sharedData_.remove(command.text);
-      else
-        sharedData_.set(command.text, command.value);
       break;
     case Kind::setDigestKey:
       writer.writeData(command.data.bytes());
       writer.writeInt32(command.algorithm);
-      digestKey_ = command.data;
-      digestAlgorithm_ = command.algorithm;
       break;
     case Kind::uploadFile:
       writer.writeString(command.text);
@@ -169,15 +141,13 @@ bool Session::encodeCommand(Command& command, uint32_t serial) {
       writer.writeArray(command.array);
       break;
     case Kind::singleMessage:
-      writer.writeDictionary(sessionInfo_);
-      writer.writeOptionalDictionary(userInfo_);
+      writer.writeDictionary(kept_.sessionInfo);
+      writer.writeOptionalDictionary(kept_.userInfo);
       writer.writeUInt16(command.category);
       writer.writeUInt16(command.type);
       writer.writeOptionalDictionary(command.dictionary);
       break;
     case Kind::startConfiguration:
-      configured_ = true;
-      break;
     case Kind::fetchDisplayURL:
     case Kind::flush:
     case Kind::finish:
@@ -191,6 +161,9 @@ bool Session::encodeCommand(Command& command, uint32_t serial) {
 
 void Session::complete(Command& command, const Message& message) {
   if (message.type == wire::MessageType::error) {
+    standing_.say(std::string(shapeOf(command.kind).member) + ": " +
+                  daemonError(message).localizedDescription);
+    if (command.replayed) replayFailed_.fetch_add(1);
     command.fail(ClientError::refused, daemonError(message).localizedDescription);
     return;
   }
@@ -200,6 +173,7 @@ void Session::complete(Command& command, const Message& message) {
     std::optional<Array> names;
     if (reader.hasSignature("aas") && reader.readOptionalStrings(names) &&
         reader.finish() == BodyStatus::ok) {
+      learnStates(names);
       std::optional<std::vector<std::string>> states;
       if (names) states = texts(*names);
       if (auto completion = std::exchange(command.statesCompletion, nullptr))
@@ -228,6 +202,16 @@ void Session::complete(Command& command, const Message& message) {
     completion(true, std::nullopt);
   }
   command.fail(ClientError::refused, "the daemon's answer has another form than this library knows");
+}
+
+void Session::learnStates(const std::optional<Array>& names) {
+  using State = KYTReporting::State;
+  if (!kept_.configured) return;
+  if (!names) return standing_.become(State::noStorebag, kept_.whyNoStorebag());
+  if (names->empty()) return standing_.become(State::noLiveBackEnd, kept_.whyNotLive());
+  std::string live;
+  for (const std::string& name : texts(*names)) live += (live.empty() ? "" : " ") + name;
+  standing_.become(State::live, std::move(live));
 }
 
 void Session::handleCall(const Message& message) {

@@ -35,6 +35,17 @@ std::string fileURL(const std::string& path) {
   return url;
 }
 
+// False, and its completion told, when a number is out of range.
+bool setMessage(Command& command, uint32_t category, uint32_t type) {
+  if ((category | type) > UINT16_MAX) {
+    command.fail(ClientError::invalid, client::outOfRange(category, type));
+    return false;
+  }
+  command.category = static_cast<uint16_t>(category);
+  command.type = static_cast<uint16_t>(type);
+  return true;
+}
+
 void chooseSocket(KYTReporting::Options& options) {
   if (!options.socketPath.empty()) return;
   const char* chosen = secure_getenv("KYTREPORTING_SOCKET");
@@ -95,18 +106,17 @@ void KYTReporting::fetchDisplayURL(TextCompletion completion) {
   enqueue(std::move(command));
 }
 
-bool KYTReporting::sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag) {
+bool KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag) {
   return implementation_->session->enqueueMessage(category, type, std::move(payload), flag);
 }
 
-void KYTReporting::sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag,
+void KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                                ObjectCompletion completion) {
   auto command = std::make_unique<Command>(Kind::messageWithReply);
-  command->category = category;
-  command->type = type;
   command->flag = flag;
   command->dictionary = std::move(payload);
   command->objectCompletion = std::move(completion);
+  if (!setMessage(*command, category, type)) return;
   enqueue(std::move(command));
 }
 
@@ -161,17 +171,43 @@ bool KYTReporting::finish(std::chrono::milliseconds timeout) {
   return implementation_->session->finishAndWait(timeout);
 }
 
+const char* KYTReporting::nameOf(State state) {
+  switch (state) {
+    case State::noDaemon:
+      return "no-daemon";
+    case State::refused:
+      return "refused";
+    case State::connected:
+      return "connected";
+    case State::noStorebag:
+      return "no-storebag";
+    case State::noLiveBackEnd:
+      return "no-live-back-end";
+    case State::live:
+      return "live";
+  }
+  return "";
+}
+
+KYTReporting::State KYTReporting::state() const {
+  return implementation_->session->state();
+}
+
+std::string KYTReporting::stateReason() const {
+  return implementation_->session->stateReason();
+}
+
 KYTReporting::Statistics KYTReporting::statistics() const {
   return implementation_->session->statistics();
 }
 
-void KYTReporting::sendSingleMessage(Options options, uint16_t category, uint16_t type,
+void KYTReporting::sendSingleMessage(Options options, uint32_t category, uint32_t type,
                                      std::optional<Dictionary> payload, TextCompletion completion) {
   auto command = std::make_unique<Command>(Kind::singleMessage);
-  command->category = category;
-  command->type = type;
   command->dictionary = std::move(payload);
   command->textCompletion = std::move(completion);
+  if (!setMessage(*command, category, type)) return;
+  options.onStateChange = nullptr;  // its context may be gone once the completion has run
   auto session = makeSession(std::move(options), true);
   session->enqueueCommand(std::move(command));
   client::Loop::current()->add(std::move(session));

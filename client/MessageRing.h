@@ -49,6 +49,16 @@ class MessageRing {
     return true;
   }
 
+  // The consumer's thread only: visits what could be popped now, in its place.
+  template <typename Visitor>
+  void forEach(Visitor&& visit) {
+    for (size_t position = head_.load(std::memory_order_relaxed);; ++position) {
+      Cell& cell = cells_[position & mask_];
+      if (cell.sequence.load(std::memory_order_acquire) != position + 1) return;
+      visit(cell.item);
+    }
+  }
+
   // Of the moment; any thread.
   [[nodiscard]] size_t size() const {
     const size_t head = head_.load(std::memory_order_relaxed);

@@ -1,6 +1,5 @@
 // One session of the client library: the queue that the program's threads fill, and the connection that the
-// library's thread keeps for it. What must survive the daemon's death (session and user information, whether
-// the session was configured, shared data, digest key) is kept here and replayed on each new connection.
+// library's thread keeps for it. What must survive the daemon's death (Kept) is replayed on each new connection.
 //
 // Threads: the operations under "any thread" only touch the ring, atomics and the overflow list; everything
 // else belongs to the library's thread (Loop).
@@ -14,8 +13,9 @@
 #include <optional>
 #include <string>
 
-#include "client/Command.h"
+#include "client/Kept.h"
 #include "client/MessageRing.h"
+#include "client/Standing.h"
 #include "platform/Mutex.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/linux/client/ClientSocket.h"
@@ -38,9 +38,11 @@ class Session {
   Session& operator=(const Session&) = delete;
 
   // Any thread.
-  bool enqueueMessage(uint16_t category, uint16_t type, Dictionary&& payload, uint32_t flag);
+  bool enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payload, uint32_t flag);
   void enqueueCommand(std::unique_ptr<Command> command);
   [[nodiscard]] KYTReporting::Statistics statistics() const;
+  [[nodiscard]] KYTReporting::State state() const { return standing_.state(); }
+  [[nodiscard]] std::string stateReason() const;
   // Says goodbye and waits; whether the daemon has taken everything. On the library's thread it does not
   // wait.
   bool finishAndWait(std::chrono::milliseconds timeout);
@@ -61,7 +63,7 @@ class Session {
   [[nodiscard]] bool wantsToWrite() const { return outAt_ < out_.size(); }
   // When pump() has something to do without being told, or none.
   [[nodiscard]] std::optional<SteadyTime> nextDeadline() const;
-  void end(ClientError code, const char* reason);  // every completion runs
+  void end(ClientError code, const std::string& reason);  // every completion runs
 
  private:
   struct Item {
@@ -86,13 +88,20 @@ class Session {
   }
   [[nodiscard]] Error refusal() const;
   void noticeWork();
+  [[nodiscard]] bool ensureConnected(SteadyTime now);
   void connect(SteadyTime now);
-  void disconnected(SteadyTime now, const char* reason);
-  void replay();
+  bool move(SteadyTime now);
+  void disconnected(SteadyTime now, std::string reason);
+  [[nodiscard]] bool givesUp() const;
+  void expire(SteadyTime now);
   bool drain();
+  void drainMessage(const Item& item);
+  void drainCommand(std::unique_ptr<Command> command);
   bool nextItem(Item& item);
   bool write(SteadyTime now);
   void pingIfDue(SteadyTime now);
+  [[nodiscard]] const char* readHandshake(size_t& at);
+  [[nodiscard]] const char* readMessages(size_t& at);
   void handle(const Message& message);
   void handleReply(const Message& message);
   void handleCall(const Message& message);
@@ -101,22 +110,34 @@ class Session {
   // Encoding (Encoding.cpp): each appends one call to out_; false when it cannot be encoded.
   bool encodeMessage(const Item& item);
   bool encodeCommand(Command& command, uint32_t serial);
-  bool encodeSessionInfo();
-  static void complete(Command& command, const Message& message);
+  bool encodeSessionInfo(const std::optional<Dictionary>& userInfo);
+  void complete(Command& command, const Message& message);
+  void learnStates(const std::optional<Array>& names);
+
+  // To a daemon that does not know the session yet (Replay.cpp).
+  void replay();
+  bool replayIdentity();
+  void replaySharedData();
+  void replayEntries(const Dictionary& entries);
+  bool sendAgain(std::unique_ptr<Command> command);
 
   // Constant.
   const std::string problem_;  // of the session's information: nothing is sent
   const std::string path_;
   const bool single_;
   const size_t maxQueuedBytes_;
+  const std::chrono::milliseconds callDeadline_;
+  const bool finishWaitsForDaemon_;
   Loop* const loop_;
 
   // Any thread.
   MessageRing<Item> ring_;
   std::atomic<size_t> queuedBytes_{0};
   std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
+  std::atomic<bool> commandQueued_{false};  // since the deadlines were last looked at
   std::atomic<uint64_t> sent_{0}, droppedQueueFull_{0}, lost_{0}, droppedClosed_{0}, droppedInvalid_{0},
-      connections_{0};
+      connections_{0}, waitedTooLong_{0}, replayFailed_{0}, sentUnconfigured_{0};
+  Standing standing_;
   Mutex overflowMutex_;
   std::deque<std::unique_ptr<Command>> overflow_
       GUARDED_BY(overflowMutex_);  // commands that found the ring full
@@ -128,17 +149,17 @@ class Session {
   bool ended_ GUARDED_BY(stateMutex_) = false;        // nothing runs any more
 
   // The library's thread.
-  Dictionary sessionInfo_;
-  std::optional<Dictionary> userInfo_;
-  Value frameworks_;
+  Kept kept_;
   Function<void(const AggregatedMessage&)> aggregationBlock_;
-  bool configured_ = false;
-  Dictionary sharedData_;
-  std::optional<Data> digestKey_;
-  int32_t digestAlgorithm_ = 0;
   linux_client::ClientSocket socket_;
   ClientHandshake handshake_;
   bool handshakeDone_ = false, ending_ = false, done_ = false;
+  bool everTaken_ = false;         // a daemon once completed a handshake
+  bool nobodyThere_ = false;       // the last attempt found no daemon, or one that refuses
+  bool daemonEnds_ = false;        // it said so in the handshake
+  bool triedAtGoodbye_ = false;    // the last attempt before giving up
+  unsigned endedInHandshake_ = 0;  // connections in a row
+  SteadyTime nextExpiry_ = SteadyTime::max();
   std::string in_, out_;
   size_t outAt_ = 0;
   std::deque<Mark> marks_;

@@ -49,6 +49,14 @@ KYTReporting::Options optionsOf(const kyt_options& given) {
   options.userInfo = optional(known.user_info);
   if (known.max_queued_messages != 0) options.maxQueuedMessages = known.max_queued_messages;
   if (known.max_queued_bytes != 0) options.maxQueuedBytes = known.max_queued_bytes;
+  if (known.on_state_change != nullptr)
+    options.onStateChange = [callback = known.on_state_change, context = known.state_context](
+                                KYTReporting::State state, const std::string& why) {
+      callback(static_cast<kyt_state>(state), why.c_str(), context);
+    };
+  if (known.call_deadline_milliseconds != 0)
+    options.callDeadline = std::chrono::milliseconds(known.call_deadline_milliseconds);
+  options.finishWaitsForDaemon = known.finish_waits_for_daemon != 0;
   if (known.aggregation != nullptr) {
     options.aggregationBlock = [callback = known.aggregation,
                                 context = known.aggregation_context](const kyt::AggregatedMessage& message) {
@@ -202,6 +210,15 @@ int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds) {
              ? 1
              : 0;
 }
+const char* kyt_state_name(kyt_state state) {
+  return KYTReporting::nameOf(static_cast<KYTReporting::State>(state));
+}
+kyt_state kyt_session_state(const kyt_session* session) {
+  return session != nullptr ? static_cast<kyt_state>(session->reporting->state()) : KYT_STATE_NO_DAEMON;
+}
+void kyt_session_state_reason(const kyt_session* session, char* reason, size_t size) {
+  copyText(session != nullptr ? session->reporting->stateReason() : "there is no session", reason, size);
+}
 void kyt_session_configure(kyt_session* session, kyt_states_callback callback, void* context) {
   if (session != nullptr) session->reporting->startConfiguration(statesCompletion(callback, context));
 }
@@ -210,7 +227,7 @@ void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary* user_i
   if (session != nullptr)
     session->reporting->fetchStates(optional(user_info), statesCompletion(callback, context));
 }
-int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type, const kyt_dictionary* payload,
+int kyt_session_send(kyt_session* session, uint32_t category, uint32_t type, const kyt_dictionary* payload,
                      uint32_t flag) {
   if (session == nullptr) return 0;
   return session->reporting->sendMessage(category, type, payload != nullptr ? payload->value : Dictionary(),
@@ -218,7 +235,7 @@ int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type, con
              ? 1
              : 0;
 }
-void kyt_session_send_with_reply(kyt_session* session, uint16_t category, uint16_t type,
+void kyt_session_send_with_reply(kyt_session* session, uint32_t category, uint32_t type,
                                  const kyt_dictionary* payload, uint32_t flag, kyt_text_callback callback,
                                  void* context) {
   if (session != nullptr)
@@ -259,11 +276,18 @@ void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t 
 void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics) {
   if (session == nullptr || statistics == nullptr) return;
   const KYTReporting::Statistics figures = session->reporting->statistics();
-  *statistics = {figures.sent,          figures.droppedQueueFull, figures.lostOnConnectionEnd,
-                 figures.droppedClosed, figures.droppedInvalid,   figures.connections,
-                 figures.queued};
+  *statistics = {figures.sent,
+                 figures.droppedQueueFull,
+                 figures.lostOnConnectionEnd,
+                 figures.droppedClosed,
+                 figures.droppedInvalid,
+                 figures.connections,
+                 figures.queued,
+                 figures.waitedTooLong,
+                 figures.replayFailed,
+                 figures.sentUnconfigured};
 }
-void kyt_send_single_message(const kyt_options* options, uint16_t category, uint16_t type,
+void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, kyt_text_callback callback, void* context) {
   if (options == nullptr || options->size == 0) return;
   KYTReporting::sendSingleMessage(optionsOf(*options), category, type, optional(payload),

@@ -1,20 +1,18 @@
-/* Reporting from C: opens a session, configures it, sends a few events, and says goodbye.
+/* Reporting from C: opens a session, configures it, sends a few events, and says goodbye. Prints where the session
+ * stands; its status is 1 when nothing can arrive.
  *
  *   report_c [SOCKET]
  */
 #include <kytreporting/kytreporting.h>
 #include <stdio.h>
 
-static void configured(const char* const* names, size_t count, int has_storebag, const char* error,
-                       void* context) {
+/* The last state that was told, which says more than the end's alone. */
+static kyt_state last = KYT_STATE_NO_DAEMON;
+
+static void changed(kyt_state state, const char* why, void* context) {
   (void)context;
-  if (error != NULL) {
-    printf("configuration failed: %s\n", error);
-  } else if (!has_storebag) {
-    printf("no storebag for this client type: nothing will be sent\n");
-  } else {
-    for (size_t i = 0; i < count; ++i) printf("live: %s\n", names[i]);
-  }
+  last = state;
+  printf("%s: %s\n", kyt_state_name(state), why);
 }
 
 int main(int argc, char** argv) {
@@ -33,12 +31,13 @@ int main(int argc, char** argv) {
   options.socket_path = argc > 1 ? argv[1] : NULL;
   options.session_info = info;
   options.user_info = user;
+  options.on_state_change = changed;
   kyt_session* session = kyt_session_open(&options);
   kyt_dictionary_free(info);
   kyt_dictionary_free(user);
 
-  /* The answer is printed when it comes; what is sent meanwhile waits its turn. */
-  kyt_session_configure(session, configured, NULL);
+  /* The states are printed when they change; what is sent meanwhile waits its turn. */
+  kyt_session_configure(session, NULL, NULL);
   kyt_dictionary* payload = kyt_dictionary_new();
   for (int i = 1; i <= 3; ++i) {
     kyt_dictionary_set_int(payload, "step", i);
@@ -51,6 +50,6 @@ int main(int argc, char** argv) {
   kyt_session_statistics(session, &figures);
   printf("sent %llu, lost %llu\n", (unsigned long long)figures.sent,
          (unsigned long long)figures.lost_on_connection_end);
-  kyt_session_close(session);
-  return all ? 0 : 1;
+  kyt_session_close(session); /* from here on no callback runs */
+  return all && last == KYT_STATE_LIVE ? 0 : 1;
 }

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/Keys.h"
 #include "tests/support/Eventually.h"
 
 namespace kyt {
@@ -23,7 +24,7 @@ class RecordingSession final : public ClientSessionInterface {
   }
   void startConfigWithCompletionHandler(StatesReply reply) override {
     record_->add("StartConfig");
-    reply(Array{"httppost", "qrs"});
+    reply(record_->states);
   }
   void fetchStatesWithUserInfo(std::optional<Dictionary> user, StatesReply reply) override {
     record_->add(user ? "FetchStates " + numberAt(*user, "ClientName") : "FetchStates none");
@@ -118,11 +119,14 @@ void TestDaemon::stop() {
 }
 
 bool TestDaemon::listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) {
-  if (!accepts_) return false;
+  if (endings_.fetch_sub(1) > 0) return false;
+  entitled_ = accepts_ && refusals_.fetch_sub(1) <= 0;
+  if (!connection->entitlementValue(kEntitlement).boolValue()) return false;
   auto record = std::make_shared<RecordedCalls>();
   record->holdFlush = holdFlush_;
-  connection->setExportedObject(std::make_shared<RecordingSession>(record));
   const std::lock_guard lock(mutex_);
+  record->states = states_;
+  connection->setExportedObject(std::make_shared<RecordingSession>(record));
   records_.push_back(std::move(record));
   connections_.push_back(connection);
   connection->resume();

@@ -26,6 +26,7 @@ struct RecordedCalls {
   std::vector<std::string> calls;
   Dictionary lastPayload;
   bool holdFlush = false;
+  std::optional<Array> states;
   std::vector<ResultReply> heldFlushes;
   Connection* connection = nullptr;
   void add(std::string call) {
@@ -43,6 +44,14 @@ class TestDaemon final : public ListenerDelegate, private Entitlements {
   // Every connection ends, the socket goes.
   void stop();
   void setAccepts(bool accepts) { accepts_ = accepts; }
+  // The next so many connections are refused without a word, or told that the daemon ends.
+  void setRefusals(int count) { refusals_ = count; }
+  void setEndings(int count) { endings_ = count; }
+  // What configurations of later connections bring; none: there is no storebag.
+  void setStates(std::optional<Array> states) {
+    const std::lock_guard lock(mutex_);
+    states_ = std::move(states);
+  }
   void setHoldFlush(bool hold) { holdFlush_ = hold; }
 
   [[nodiscard]] size_t connections() const;
@@ -58,11 +67,14 @@ class TestDaemon final : public ListenerDelegate, private Entitlements {
       Listener& listener, const std::shared_ptr<Connection>& connection) override;
 
  private:
-  [[nodiscard]] Value valueFor(const PeerCredentials&, std::string_view) override { return true; }
+  [[nodiscard]] Value valueFor(const PeerCredentials&, std::string_view) override { return entitled_.load(); }
 
   struct Running;
   const std::string path_;
   std::atomic<bool> accepts_{true}, holdFlush_{false};
+  std::atomic<int> refusals_{0}, endings_{0};
+  std::atomic<bool> entitled_{true};
+  std::optional<Array> states_ = Array{"httppost", "qrs"};
   Limits limits_;
   Counters counters_;
   MemoryLogSink sink_;

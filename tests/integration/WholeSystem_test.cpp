@@ -40,6 +40,26 @@ TEST_F(WholeSystem, CarriesTheEventsOfTheExamples) {
   EXPECT_EQ(total("bad"), 0);
 }
 
+TEST_F(WholeSystem, LetsTheExamplesSayWhatIsWrongAndEnd) {
+  for (const char* program : {KYT_EXAMPLE_CPP, KYT_EXAMPLE_C}) {
+    const ProgramRun example = runProgram(program, {"/nonexistent"});
+    EXPECT_EQ(example.status, 1) << program;
+    EXPECT_NE(example.text.find("no-daemon: /nonexistent: No such file or directory\n"), std::string::npos)
+        << example.text;
+  }
+  lay();
+  putBag("cadmor", {entry("somebody else")});
+  startDaemon();
+  for (const char* program : {KYT_EXAMPLE_CPP, KYT_EXAMPLE_C}) {
+    const ProgramRun example = runProgram(program, {socket()});
+    EXPECT_EQ(example.status, 1) << program;
+    EXPECT_NE(example.text.find("no-live-back-end: no entry of the storebag is switched on for ClientName "
+                                "\"example\", ServiceName \"demo\""),
+              std::string::npos)
+        << example.text;
+  }
+}
+
 TEST_F(WholeSystem, PostsNothingOfAnOwnerWhoWithdrewConsentUnlessTheBagOverrides) {
   lay();
   Dictionary overriding = entry("overriding");

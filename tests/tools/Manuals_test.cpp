@@ -230,7 +230,7 @@ TEST(ManualOfTheLibrary, NamesEachFunctionOfTheHeaders) {
   const std::string header = textOf("client/include/kytreporting/KYTReporting.h");
   const size_t at = header.find("class KYT_EXPORT KYTReporting");
   const Names operations = matchesIn(header.substr(at, header.find(" private:", at) - at),
-                                     "\n  [A-Za-z:\\[\\]<> _]*?\\b((?!void)[a-z][A-Za-z]+)\\(");
+                                     "\n  [A-Za-z:\\[\\]<> _*]*?\\b((?!void)[a-z][A-Za-z]+)\\(");
   EXPECT_GE(operations.size(), 13U);
   EXPECT_EQ(matchesIn(page, "\\.Fn ([a-z][A-Za-z]+)[ \n]"), operations);
 }

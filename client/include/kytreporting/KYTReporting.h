@@ -6,12 +6,19 @@
 // ("kytreporting", started with the first session, shared by all) talks to the daemon. What does not fit is
 // dropped and counted in `statistics()`; nothing is lost silently.
 //
-// The daemon may not run yet, may die, may return: the library connects again, replays the session's
-// information, its configuration, its shared data and its digest key, and counts what was lost.
+// The daemon may not run yet, may die, may return: the library connects again, after a tenth of a second at first
+// and five seconds at the latest, and tells it again who the session is: its information and user information, that
+// it was configured, its shared data and its digest key, as far as they could be sent before. What is still queued
+// then waits for the next daemon; what was written and not acknowledged is counted as lost. state() and
+// Options::onStateChange say where the session stands. With KYTREPORTING_DEBUG=1 in the environment (not of
+// set-user-ID programs) every change of the state and every drop is a line on standard error.
 //
-// Threads: every operation may be called from any thread. Completions and the aggregation block run on the
-// library's thread, one at a time; they must not block, and may call anything here. A completion runs exactly
-// once: with the daemon's answer, or with an error when the connection ends or the session closes first.
+// Threads: every operation may be called from any thread. Completions and the blocks of Options run on the library's
+// thread, one at a time; they must not block, and may call anything here. A call that fails at once (the session
+// is closed or its information wrong, no room, a file that cannot be opened, a number out of range) runs its
+// completion before it returns, on the caller's thread.
+// A completion runs exactly once: with the daemon's answer, or with an error when the connection ends after the call
+// was written, when no daemon took it within Options::callDeadline, or when the session closes first.
 // Ownership: arguments are copied (objects share their contents, copying costs a pointer).
 // Errors: values; nothing throws but std::bad_alloc.
 // Fork: in a child process made by fork() the sessions of the parent are inert: sending answers false.
@@ -47,11 +54,13 @@ struct Command;
 // The domain of errors that the library itself gives, and their codes.
 inline constexpr char kKYTReportingClientErrorDomain[] = "KYTReportingClientErrorDomain";
 enum class ClientError : int32_t {
-  notConnected = 1,  // the connection ended before the answer
-  closed = 2,        // the session was closed, or belongs to the parent of this process
-  queueFull = 3,     // the bounded queue had no room
-  refused = 4,       // the daemon answered with an error (the description has its text)
-  invalid = 5,       // the arguments cannot be meant or sent so (the description names what)
+  notConnected =
+      1,          // the connection ended before the answer, or there is no daemon (the description says why)
+  closed = 2,     // the session was closed, or belongs to the parent of this process
+  queueFull = 3,  // the bounded queue had no room
+  refused = 4,    // the daemon answered with an error (the description has its text)
+  invalid = 5,    // the arguments cannot be meant or sent so (the description names what)
+  timedOut = 6,   // no daemon took the call within Options::callDeadline
 };
 
 // A session's information, typed: what a misspelt key or a value of another type cannot happen to.
@@ -86,6 +95,18 @@ struct AggregatedMessage {
 
 class KYT_EXPORT KYTReporting {
  public:
+  // How far the session's messages get, as far as the library can know.
+  enum class State : uint8_t {
+    noDaemon = 0,       // no connection: no socket, nobody listens, or the connection ended
+    refused = 1,        // the daemon does not serve this program, or the session's information is wrong
+    connected = 2,      // connected, and not configured yet: the daemon drops what is sent
+    noStorebag = 3,     // configured, without a storebag: the daemon drops what is sent
+    noLiveBackEnd = 4,  // configured, and no back end takes events
+    live = 5,           // at least one back end takes events (filters and sampling may still leave some out)
+  };
+  // "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live".
+  [[nodiscard]] static const char* nameOf(State state);
+
   struct Options {
     // The daemon's socket. Empty: the environment's KYTREPORTING_SOCKET, or
     // /run/kytreportingd/com.vantu.kytreportingd.
@@ -101,6 +122,18 @@ class KYT_EXPORT KYTReporting {
     // Bounds of the queue towards the daemon: messages (64 to 65536) and the bytes of their encoded form.
     size_t maxQueuedMessages = 4096;
     size_t maxQueuedBytes = 4u << 20;
+    // Told, on the library's thread, when the state or its reason changes; the reason is a text for people that
+    // names what the library knows: the path and the system's error, the client type, the names that no entry
+    // has. Not told of the end that the program itself asks for, nor for single messages.
+    Function<void(State state, const std::string& why)> onStateChange;
+    // How long the completion of a call waits for a daemon that is not there; then it gets an error of the code
+    // timedOut. startConfiguration, fetchStates, shared data and the digest key still reach a daemon that comes
+    // later; messages with a reply, flushes and uploads do not. Zero or less: as long as the session lives. An
+    // answer of a daemon that has taken the call is waited for without a limit.
+    std::chrono::milliseconds callDeadline = std::chrono::seconds(30);
+    // Whether finish() waits, with what is queued, for a daemon that never took anything of this session. If
+    // not, it tries once more to connect and gives up, so that programs end at once where there is no daemon.
+    bool finishWaitsForDaemon = false;
   };
 
   struct Statistics {
@@ -112,6 +145,9 @@ class KYT_EXPORT KYTReporting {
     uint64_t droppedInvalid = 0;  // could not be encoded, or their session's information is wrong
     uint64_t connections = 0;     // connections made, the first included
     uint64_t queued = 0;          // in the queue now
+    uint64_t waitedTooLong = 0;   // calls whose completion waited for a daemon until the deadline
+    uint64_t replayFailed = 0;    // values that a daemon that came back could not be told again
+    uint64_t sentUnconfigured = 0;  // sent before startConfiguration: the daemon dropped them
   };
 
   // What is wrong with a session's information: a key that there is not, or a value of another type or out of
@@ -138,12 +174,13 @@ class KYT_EXPORT KYTReporting {
   void fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion = nullptr);
   void fetchDisplayURL(TextCompletion completion);
 
-  // Queues one message; whether it was taken. No system call, no wait for a lock (a sleeping library thread
+  // Queues one message; whether it was taken. Category and type are 0 to 65535; other numbers are refused, and
+  // counted in droppedInvalid. Category 0 is the daemon's own: its type 0 is a session's start, type 1 its end. No system call, no wait for a lock (a sleeping library thread
   // is woken by the first message after a pause). Flags: 1 realtime, 2 expedite, 3 both, anything else
   // neither.
-  bool sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag = 0);
+  bool sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag = 0);
   // The same with the daemon's answer: the text of what was posted, or none.
-  void sendMessage(uint16_t category, uint16_t type, Dictionary payload, uint32_t flag,
+  void sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                    ObjectCompletion completion);
   // Everything queued before it is sent first; the completion gets the result or the first back end's error.
   void flush(ObjectCompletion completion = nullptr);
@@ -159,13 +196,19 @@ class KYT_EXPORT KYTReporting {
   void uploadLogData(Array logData, SuccessCompletion completion = nullptr);
 
   // Says goodbye: what is queued is sent, the session is marked as finished gracefully and closed. Waits for
-  // that at most `timeout` of real time; whether all was sent.
+  // that at most `timeout` of real time; whether all was sent. Gives up at once when no daemon ever took anything
+  // and none is there (see Options::finishWaitsForDaemon); stateReason() then says why. Called from a completion
+  // it does not wait, and returns false.
   bool finish(std::chrono::milliseconds timeout = std::chrono::seconds(5));
 
   [[nodiscard]] Statistics statistics() const;
+  // Where the session stands now, and why. After its end: where it stood. In a child process made by fork() the
+  // state is the parent's of that moment.
+  [[nodiscard]] State state() const;
+  [[nodiscard]] std::string stateReason() const;
 
   // One event without a session of its own: the completion gets "finished", or what went wrong.
-  static void sendSingleMessage(Options options, uint16_t category, uint16_t type,
+  static void sendSingleMessage(Options options, uint32_t category, uint32_t type,
                                 std::optional<Dictionary> payload, TextCompletion completion);
 
  private:

@@ -3,11 +3,13 @@
  * The same library as <kytreporting/KYTReporting.h>, with the same promises: nothing blocks the caller on the
  * daemon or the network; what does not fit into the bounded queue is dropped and counted; a daemon that dies
  * and returns is connected again. Callbacks run on the library's thread, one at a time, each exactly once;
- * they must not block.
+ * they must not block. A call that fails at once (the session is closed or its information wrong, no room, a number
+ * out of range) calls back before it returns, on the caller's thread.
  *
  * Strings are UTF-8 and NUL-terminated and are copied. Objects made by kyt_..._new are owned by the caller
  * until they are freed or taken by a function that says so. Functions that answer int answer 1 for yes and 0
- * for no. A null session, dictionary or key is an error of the caller that is answered with 0 or nothing.
+ * for no. A null session, dictionary or key is an error of the caller that is answered with 0 or nothing. KYTREPORTING_DEBUG=1 in the environment makes every change of a
+ * session's state, and every drop, a line on standard error.
  */
 #ifndef KYTREPORTING_H
 #define KYTREPORTING_H
@@ -73,6 +75,20 @@ typedef void (*kyt_aggregation_callback)(const kyt_dictionary* session_info, dou
                                          uint16_t category, uint16_t type, const kyt_dictionary* payload,
                                          void* context);
 
+/* How far a session's messages get, as far as the library can know. */
+typedef enum kyt_state {
+  KYT_STATE_NO_DAEMON = 0,        /* no connection: no socket, nobody listens, or the connection ended */
+  KYT_STATE_REFUSED = 1,          /* the daemon does not serve this program, or the information is wrong */
+  KYT_STATE_CONNECTED = 2,        /* connected, and not configured yet: the daemon drops what is sent */
+  KYT_STATE_NO_STOREBAG = 3,      /* configured, without a storebag: the daemon drops what is sent */
+  KYT_STATE_NO_LIVE_BACK_END = 4, /* configured, and no back end takes events */
+  KYT_STATE_LIVE = 5              /* at least one back end takes events */
+} kyt_state;
+/* "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live"; never freed. */
+KYT_API const char* kyt_state_name(kyt_state state);
+/* `why` is a text for people. */
+typedef void (*kyt_state_callback)(kyt_state state, const char* why, void* context);
+
 typedef struct kyt_options {
   size_t size;                          /* sizeof(kyt_options): how the library knows which fields exist */
   const char* socket_path;              /* null: as usual */
@@ -80,8 +96,14 @@ typedef struct kyt_options {
   const kyt_dictionary* user_info;      /* "ClientName", "ServiceName", ...; null: none */
   kyt_aggregation_callback aggregation; /* null: the session does not aggregate */
   void* aggregation_context;
-  size_t max_queued_messages; /* 0: the default, 4096 */
-  size_t max_queued_bytes;    /* 0: the default, 4 MiB */
+  size_t max_queued_messages;         /* 0: the default, 4096 */
+  size_t max_queued_bytes;            /* 0: the default, 4 MiB */
+  kyt_state_callback on_state_change; /* null: nobody is told */
+  void* state_context;
+  /* How long a callback waits for a daemon that is not there. 0: the default, 30000; negative: as long as the session
+   * lives. */
+  int64_t call_deadline_milliseconds;
+  int finish_waits_for_daemon; /* 0: kyt_session_finish gives up when no daemon ever took anything and none is there */
 } kyt_options;
 
 /* Whether a session's information can be meant so: 0 when it has a key that there is not, or a value of another
@@ -94,19 +116,25 @@ KYT_API int kyt_session_info_check(const kyt_dictionary* session_info, char* err
 KYT_API kyt_session* kyt_session_open(const kyt_options* options);
 /* What was queued and not sent is lost; finish first to keep it. No callback runs after it has returned. */
 KYT_API void kyt_session_close(kyt_session* session);
-/* Sends what is queued, says goodbye, waits at most so many milliseconds; whether all was sent. */
+/* Sends what is queued, says goodbye, waits at most so many milliseconds; whether all was sent. Gives up at once when no
+ * daemon ever took anything and none is there. */
 KYT_API int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds);
+
+/* Where the session stands; KYT_STATE_NO_DAEMON for null. */
+KYT_API kyt_state kyt_session_state(const kyt_session* session);
+/* Why, as a text of at most `size` - 1 bytes, cut to fit and NUL-terminated. */
+KYT_API void kyt_session_state_reason(const kyt_session* session, char* reason, size_t size);
 
 KYT_API void kyt_session_configure(kyt_session* session, kyt_states_callback callback, void* context);
 /* New user information; null: as it was. */
 KYT_API void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary* user_info,
                                       kyt_states_callback callback, void* context);
-/* Whether the message was taken. `payload` may be null and stays the caller's. Flags: 1 realtime, 2 expedite,
- * 3 both. */
-KYT_API int kyt_session_send(kyt_session* session, uint16_t category, uint16_t type,
+/* Whether the message was taken. Category and type are 0 to 65535; other numbers are refused. `payload` may be null and
+ * stays the caller's. Flags: 1 realtime, 2 expedite, 3 both. */
+KYT_API int kyt_session_send(kyt_session* session, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, uint32_t flag);
 /* The same with the daemon's answer: the text of what was posted, or null. */
-KYT_API void kyt_session_send_with_reply(kyt_session* session, uint16_t category, uint16_t type,
+KYT_API void kyt_session_send_with_reply(kyt_session* session, uint32_t category, uint32_t type,
                                          const kyt_dictionary* payload, uint32_t flag,
                                          kyt_text_callback callback, void* context);
 KYT_API void kyt_session_fetch_display_url(kyt_session* session, kyt_text_callback callback, void* context);
@@ -127,12 +155,12 @@ KYT_API void kyt_session_upload_log_data(kyt_session* session, const kyt_array* 
 
 typedef struct kyt_statistics {
   uint64_t sent, dropped_queue_full, lost_on_connection_end, dropped_closed, dropped_invalid, connections,
-      queued;
+      queued, waited_too_long, replay_failed, sent_unconfigured;
 } kyt_statistics;
 KYT_API void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics);
 
 /* One event without a session of its own; the callback gets "finished", or what went wrong. */
-KYT_API void kyt_send_single_message(const kyt_options* options, uint16_t category, uint16_t type,
+KYT_API void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                                      const kyt_dictionary* payload, kyt_text_callback callback,
                                      void* context);
 

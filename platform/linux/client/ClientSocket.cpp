@@ -32,17 +32,26 @@ void ClientSocket::close() {
   if (fd_ >= 0) ::close(std::exchange(fd_, -1));
 }
 
-Outcome ClientSocket::connect(const std::string& path, ClientSocket& out) {
+Outcome ClientSocket::connect(const std::string& path, ClientSocket& out, std::string& problem) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) return Outcome::ended;
+  if (path.size() >= sizeof address.sun_path) {
+    problem =
+        path + ": a socket's path has at most " + std::to_string(sizeof address.sun_path - 1) + " bytes";
+    return Outcome::ended;
+  }
   std::memcpy(address.sun_path, path.data(), path.size());
   ClientSocket made;
   made.fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  if (made.fd_ < 0) return Outcome::wouldBlock;
+  if (made.fd_ < 0) {
+    problem = path + ": " + std::strerror(errno);
+    return Outcome::wouldBlock;
+  }
   while (::connect(made.fd_, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
     if (errno == EINTR) continue;
-    return errno == EAGAIN ? Outcome::wouldBlock : Outcome::ended;
+    const int error = errno;
+    problem = path + ": " + (error == EAGAIN ? "too many connections wait" : std::strerror(error));
+    return error == EAGAIN ? Outcome::wouldBlock : Outcome::ended;
   }
   out = std::move(made);
   return Outcome::done;
@@ -158,6 +167,12 @@ bool startThread(const char* name, void (*run)(void*), void* argument) {
   pthread_sigmask(SIG_SETMASK, &before, nullptr);
   if (result != 0) delete start;
   return result == 0;
+}
+
+void writeLineToStandardError(std::string_view line) {
+  std::string text(line);
+  text += '\n';
+  [[maybe_unused]] const ssize_t written = write(STDERR_FILENO, text.data(), text.size());
 }
 
 void atFork(void (*prepare)(), void (*parent)(), void (*child)()) {

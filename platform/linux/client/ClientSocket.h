@@ -23,9 +23,9 @@ class ClientSocket {
   ClientSocket(ClientSocket&& other) noexcept;
   ClientSocket& operator=(ClientSocket&& other) noexcept;
   ~ClientSocket() { close(); }
-  // wouldBlock: the listener's backlog is full, try again later; ended: nobody listens, or the path is too
-  // long.
-  [[nodiscard]] static Outcome connect(const std::string& path, ClientSocket& out);
+  // wouldBlock: the listener's backlog is full, or there is no descriptor left: try again later; ended: nobody
+  // listens, or the path is too long. Then `problem` has the path and the reason.
+  [[nodiscard]] static Outcome connect(const std::string& path, ClientSocket& out, std::string& problem);
   // Writes a prefix of `bytes`, `descriptors` with the first byte; `written` is more than 0 when done.
   [[nodiscard]] Outcome write(std::string_view bytes, std::span<const int> descriptors, size_t& written);
   // Appends what has come to `buffer`, at most 64 KiB.
@@ -69,6 +69,8 @@ class WaitSet {
 [[nodiscard]] uint32_t effectiveUser();
 // Starts a detached thread of that name (a literal) in which no signal of the program is handled.
 bool startThread(const char* name, void (*run)(void*), void* argument);
+// One line to standard error, in one write; a line that cannot be written is lost.
+void writeLineToStandardError(std::string_view line);
 // Registered once for the process.
 void atFork(void (*prepare)(), void (*parent)(), void (*child)());
 

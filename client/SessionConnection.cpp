@@ -1,0 +1,316 @@
+// A session's connection: the library's thread alone.
+#include <algorithm>
+#include <utility>
+
+#include "client/Session.h"
+#include "platform/ipc/MessageReader.h"
+
+namespace kyt::client {
+
+namespace {
+
+using linux_client::ClientSocket;
+using linux_client::Outcome;
+using State = KYTReporting::State;
+using std::chrono::milliseconds;
+
+// Encoded bytes waiting for the socket: what a broken connection can lose.
+constexpr size_t kWriteAhead = 64 * 1024;
+constexpr uint64_t kMaxReplyBytes = 64u << 20;
+constexpr milliseconds kPingInterval{250}, kFirstBackoff{100}, kLastBackoff{5000};
+// Connections in a row that end before the daemon's first byte. It tells a client that it refuses nothing; one
+// such end may be the daemon's own.
+constexpr unsigned kRefusals = 2;
+
+const char* reasonOfConnected(bool configured) {
+  return configured ? "the configuration is on its way" : "startConfiguration was not called yet";
+}
+
+}  // namespace
+
+bool Session::hasWork() const {
+  return closed_.load() || commandQueued_.load() ||
+         ((!ring_.empty() || overflowed_.load() > 0) && handshakeDone_);
+}
+
+std::optional<SteadyTime> Session::nextDeadline() const {
+  if (handshakeDone_) {
+    if (!unacknowledged_.empty() && !pingOutstanding_) return lastPing_ + kPingInterval;
+    return std::nullopt;
+  }
+  const SteadyTime next = socket_.isOpen() ? nextExpiry_ : std::min(nextExpiry_, nextAttempt_);
+  if (next == SteadyTime::max()) return std::nullopt;
+  return next;
+}
+
+bool Session::pump(SteadyTime now) {
+  if (done_) return false;
+  if (closed_) {
+    end(problem_.empty() ? ClientError::closed : ClientError::invalid,
+        problem_.empty() ? "the session was closed" : problem_);
+    return false;
+  }
+  expire(now);
+  const bool moved = ensureConnected(now) && move(now);
+  if (done_) return moved;
+  if (standing_.debugs()) standing_.sayDrops(statistics());
+  standing_.announce();
+  return moved;
+}
+
+bool Session::ensureConnected(SteadyTime now) {
+  if (done_) return false;
+  if (socket_.isOpen()) return true;
+  if (saidGoodbye_ && !std::exchange(triedAtGoodbye_, true)) nextAttempt_ = now;
+  if (now >= nextAttempt_) connect(now);
+  if (!done_ && givesUp()) end(ClientError::notConnected, standing_.why());
+  return !done_ && socket_.isOpen();
+}
+
+// Nothing was ever taken, and nobody is there to take anything: a program that ends need not wait.
+bool Session::givesUp() const {
+  return saidGoodbye_ && triedAtGoodbye_ && nobodyThere_ && !everTaken_ && !finishWaitsForDaemon_ &&
+         !socket_.isOpen();
+}
+
+bool Session::move(SteadyTime now) {
+  bool moved = false;
+  for (;;) {
+    const bool drained = handshakeDone_ && !ending_ && drain();
+    if (handshakeDone_) pingIfDue(now);
+    const bool written = wantsToWrite() && write(now);
+    moved |= drained || written;
+    if (!drained || wantsToWrite() || !socket_.isOpen()) return moved;
+  }
+}
+
+void Session::connect(SteadyTime now) {
+  ClientSocket made;
+  std::string problem;
+  const Outcome outcome = ClientSocket::connect(path_, made, problem);
+  if (outcome != Outcome::done) {
+    nobodyThere_ = outcome == Outcome::ended;
+    endedInHandshake_ = 0;
+    backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
+    nextAttempt_ = now + backoff_;
+    standing_.become(State::noDaemon, problem);
+    if (single_ && nobodyThere_) end(ClientError::notConnected, problem);
+    return;
+  }
+  socket_ = std::move(made);
+  connections_.fetch_add(1);
+  handshake_ = ClientHandshake();
+  handshakeDone_ = false;
+  out_ = ClientHandshake::opening(linux_client::effectiveUser());
+  outAt_ = 0;
+  if (standing_.state() == State::noDaemon)
+    standing_.note(State::noDaemon, path_ + ": the daemon has not answered yet");
+}
+
+void Session::disconnected(SteadyTime now, std::string reason) {
+  if (done_) return;
+  reason = path_ + ": " + reason;
+  const bool taken = handshakeDone_;
+  // A daemon that ends says so, and the next one takes the connection; one that cannot say so any more, or refuses,
+  // is silent.
+  if (std::exchange(daemonEnds_, false))
+    endedInHandshake_ = 0;
+  else if (!taken)
+    nobodyThere_ = ++endedInHandshake_ >= kRefusals;
+  const bool refused = !taken && nobodyThere_;
+  if (refused)
+    reason +=
+        ": the daemon refuses this user and program (kytctl entitlements check says why), or has too many "
+        "connections";
+  standing_.become(refused ? State::refused : State::noDaemon, reason);
+  socket_.close();
+  connected_ = false;
+  handshakeDone_ = pingOutstanding_ = false;
+  commandQueued_ = true;  // deadlines count again
+  in_.clear();
+  out_.clear();
+  outAt_ = 0;
+  for (const Mark& mark : marks_)
+    for (const int descriptor : mark.descriptors) linux_client::closeDescriptor(descriptor);
+  marks_.clear();
+  uint64_t lost = 0;
+  for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
+  unacknowledged_.clear();
+  lost_.fetch_add(lost);
+  backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
+  nextAttempt_ = now + backoff_;
+  std::deque<Pending> pending;
+  pending.swap(pending_);
+  for (Pending& entry : pending) entry.command->fail(ClientError::notConnected, reason);
+  if (ending_ || (single_ && (taken || refused))) end(ClientError::notConnected, reason);
+}
+
+bool Session::drain() {
+  bool any = false;
+  Item item;
+  while (out_.size() - outAt_ < kWriteAhead && !ending_ && nextItem(item)) {
+    any = true;
+    if (item.command)
+      drainCommand(std::move(item.command));
+    else
+      drainMessage(item);
+  }
+  return any;
+}
+
+void Session::drainMessage(const Item& item) {
+  if (!encodeMessage(item)) {
+    standing_.say("message of category " + std::to_string(item.category) + ", type " +
+                  std::to_string(item.type) + ": larger than a megabyte, or nested too deeply");
+    droppedInvalid_.fetch_add(1);
+    return;
+  }
+  sent_.fetch_add(1, std::memory_order_relaxed);
+  if (!kept_.configured && sentUnconfigured_.fetch_add(1, std::memory_order_relaxed) == 0)
+    standing_.become(State::connected,
+                     "messages are sent, and startConfiguration was not called: the daemon drops them");
+  if (unacknowledged_.empty() || unacknowledged_.back().serial != serial_ - 1)
+    unacknowledged_.push_back({0, 0});
+  unacknowledged_.back().serial = serial_;
+  ++unacknowledged_.back().count;
+}
+
+void Session::drainCommand(std::unique_ptr<Command> command) {
+  if (!command->given) return;
+  if (command->kind == Command::Kind::finish) ending_ = true;
+  const uint32_t serial = ++serial_;
+  if (!encodeCommand(*command, serial)) {
+    droppedInvalid_.fetch_add(1);
+    command->fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
+    return;
+  }
+  kept_.takeOver(*command);
+  if (command->kind == Command::Kind::startConfiguration && standing_.state() == State::connected)
+    standing_.note(State::connected, reasonOfConnected(true));
+  pending_.push_back({serial, std::move(command)});
+}
+
+bool Session::write(SteadyTime now) {
+  bool any = false;
+  while (wantsToWrite()) {
+    std::vector<int> descriptors;
+    size_t end = out_.size();
+    const bool marked = !marks_.empty() && marks_.front().offset == outAt_;
+    if (marked) descriptors = marks_.front().descriptors;
+    const size_t next = marked ? 1 : 0;
+    if (marks_.size() > next) end = marks_[next].offset;
+    size_t written = 0;
+    const Outcome outcome =
+        socket_.write(std::string_view(out_).substr(outAt_, end - outAt_), descriptors, written);
+    if (outcome == Outcome::wouldBlock) return any;
+    if (outcome == Outcome::ended) {
+      readable(now);  // what the daemon said before it ended the connection
+      if (!done_ && socket_.isOpen()) disconnected(now, "the connection ended");
+      return any;
+    }
+    if (marked) {
+      for (const int descriptor : descriptors) linux_client::closeDescriptor(descriptor);
+      marks_.pop_front();
+    }
+    outAt_ += written;
+    any = true;
+  }
+  out_.clear();
+  outAt_ = 0;
+  return any;
+}
+
+void Session::pingIfDue(SteadyTime now) {
+  if (unacknowledged_.empty() || pingOutstanding_ || now - lastPing_ < kPingInterval) return;
+  auto ping = std::make_unique<Command>(Command::Kind::ping);
+  const uint32_t serial = ++serial_;
+  if (!encodeCommand(*ping, serial)) return;
+  pending_.push_back({serial, std::move(ping)});
+  pingOutstanding_ = true;
+  lastPing_ = now;
+}
+
+void Session::readable(SteadyTime now) {
+  Outcome outcome = Outcome::done;
+  for (int reads = 0; reads < 16 && outcome == Outcome::done; ++reads) outcome = socket_.read(in_);
+  size_t at = 0;
+  const char* problem = !handshakeDone_ && !in_.empty() ? readHandshake(at) : nullptr;
+  if (handshakeDone_ && problem == nullptr) problem = readMessages(at);
+  if (done_) return;
+  in_.erase(0, at);
+  if (problem == nullptr && outcome == Outcome::ended)
+    problem = handshakeDone_ ? "the connection ended" : "the connection ended before the daemon answered";
+  if (problem != nullptr) disconnected(now, problem);
+}
+
+// What was wrong, or null; `at` goes on by what was read.
+const char* Session::readHandshake(size_t& at) {
+  size_t consumed = 0;
+  const auto status = handshake_.feed(std::as_bytes(std::span(in_)).subspan(at), consumed);
+  at += consumed;
+  if (status == ClientHandshake::Status::failed) {
+    daemonEnds_ = handshake_.serverEnds();
+    if (!daemonEnds_) endedInHandshake_ = kRefusals;
+    return handshake_.problem();
+  }
+  if (status != ClientHandshake::Status::done) return nullptr;
+  handshakeDone_ = everTaken_ = true;
+  nobodyThere_ = false;
+  endedInHandshake_ = 0;
+  connected_.store(true, std::memory_order_seq_cst);
+  backoff_ = milliseconds(0);
+  standing_.become(State::connected, reasonOfConnected(kept_.configured));
+  replay();
+  return nullptr;
+}
+
+const char* Session::readMessages(size_t& at) {
+  while (at < in_.size() && !done_) {
+    Message message;
+    const Frame frame = readMessage(std::as_bytes(std::span(in_)).subspan(at), kMaxReplyBytes, message);
+    if (frame.status == FrameStatus::incomplete) return nullptr;
+    if (frame.status == FrameStatus::tooLong || frame.status == FrameStatus::malformed)
+      return "the daemon's answer was malformed";
+    if (frame.status == FrameStatus::complete) handle(message);
+    at += frame.size;
+  }
+  return nullptr;
+}
+
+void Session::handle(const Message& message) {
+  switch (message.type) {
+    case wire::MessageType::methodReturn:
+    case wire::MessageType::error:
+      handleReply(message);
+      return;
+    case wire::MessageType::methodCall:
+      handleCall(message);
+      return;
+    case wire::MessageType::signal:
+      return;
+  }
+}
+
+void Session::acknowledge(uint32_t serial) {
+  while (!unacknowledged_.empty() && static_cast<int32_t>(unacknowledged_.front().serial - serial) < 0)
+    unacknowledged_.pop_front();
+}
+
+void Session::handleReply(const Message& message) {
+  const auto found = std::find_if(pending_.begin(), pending_.end(), [&message](const Pending& entry) {
+    return entry.serial == message.replySerial;
+  });
+  if (found == pending_.end()) return;
+  acknowledge(message.replySerial);
+  std::unique_ptr<Command> command = std::move(found->command);
+  pending_.erase(found);
+  if (command->kind == Command::Kind::ping) {
+    pingOutstanding_ = false;
+    return;
+  }
+  const bool last = command->kind == Command::Kind::finish || single_;
+  complete(*command, message);
+  if (last) end(ClientError::closed, "the session was closed");
+}
+
+}  // namespace kyt::client

@@ -1,0 +1,58 @@
+// Where a session stands, and who is told: the program by its block, and whoever set KYTREPORTING_DEBUG by lines
+// on standard error.
+//
+// Threads: state() and why() any thread; everything else the library's thread, and once nothing runs for the
+// session any more, the thread that closes it.
+#pragma once
+
+#include <atomic>
+#include <deque>
+#include <string>
+#include <utility>
+
+#include "kytreporting/KYTReporting.h"
+#include "platform/Mutex.h"
+
+namespace kyt::client {
+
+class Standing {
+ public:
+  using State = KYTReporting::State;
+  using Block = Function<void(State, const std::string&)>;
+
+  // `name` begins the lines on standard error: which session.
+  Standing(std::string name, Block block);
+
+  [[nodiscard]] State state() const { return state_.load(std::memory_order_acquire); }
+  [[nodiscard]] std::string why() const;
+  [[nodiscard]] bool debugs() const { return debugs_; }
+
+  // Takes over the state and its reason; the block is told by the next announce() when either changed.
+  void become(State state, std::string why);
+  // The same for a reason that is not worth telling.
+  void note(State state, std::string why);
+  // Runs the block for what became. It may close the session.
+  void announce();
+  void dropBlock() {
+    over_ = true;
+    block_ = nullptr;
+  }
+
+  // Lines on standard error, if they are wanted; say() on any thread.
+  void say(const std::string& text) const;
+  void sayDrops(const KYTReporting::Statistics& figures);
+
+ private:
+  const std::string name_;
+  const bool debugs_;
+  std::atomic<State> state_{State::noDaemon};
+  mutable Mutex mutex_;
+  std::string why_ GUARDED_BY(mutex_);
+  Block block_;
+  bool over_ = false;  // the block is told nothing more
+  std::deque<std::pair<State, std::string>> changes_;
+  std::string told_;  // the last reason that was worth telling, with its state
+  KYTReporting::Statistics said_;
+};
+
+}  // namespace kyt::client
