@@ -10,6 +10,7 @@
 #include <future>
 #include <thread>
 
+#include "client/Loop.h"
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
@@ -461,7 +462,7 @@ TEST_F(KYTReportingTest, WorksOnWhenThereWasNoDescriptorForItsWakeUp) {
     setrlimit(RLIMIT_NOFILE, &before);
     bool right = statesOf(*session) == "httppost qrs ";
     for (int i = 0; i < 3; ++i) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));  // the library's thread sleeps after 20
+      right = right && eventually([] { return client::Loop::current()->sleeps(); });
       right = right && statesOf(*session) == "httppost qrs ";
     }
     _exit(right ? 0 : 1);
