@@ -1,8 +1,11 @@
 #include "kytreporting/KYTReporting.h"
 
 #include <gtest/gtest.h>
+#include <linux/seccomp.h>
 #include <pthread.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -416,11 +419,12 @@ TEST_F(KYTReportingTest, TakesMessagesFromManyThreadsAtOnceAndLosesNone) {
   EXPECT_EQ(session->statistics().sent, taken.load());
 }
 
+#ifndef __has_feature
+#define __has_feature(feature) 0
+#endif
 // A forked child of a process with threads is nothing that the thread sanitizer follows.
-#if defined(__has_feature)
 #if __has_feature(thread_sanitizer)
 #define KYT_NO_FORK_TEST 1
-#endif
 #endif
 #ifndef KYT_NO_FORK_TEST
 TEST_F(KYTReportingTest, IsInertInAForkedChildWhichMayOpenSessionsOfItsOwn) {
@@ -446,6 +450,33 @@ TEST_F(KYTReportingTest, IsInertInAForkedChildWhichMayOpenSessionsOfItsOwn) {
   EXPECT_EQ(daemon_.count("Send 8"), 1u);
   EXPECT_EQ(daemon_.count("Send 1"), 1u);
 }
+
+#if !defined(__SANITIZE_ADDRESS__) && !__has_feature(address_sanitizer)
+// In a thread that the kernel kills at any call but read, write and its own end.
+TEST_F(KYTReportingTest, SendsAMessageWithoutASystemCall) {
+  ASSERT_TRUE(daemon_.start());
+  const pid_t child = fork();
+  if (child == 0) {
+    alarm(static_cast<unsigned>(kTestDeadline.count()));
+    const auto session = KYTReporting::open(options(65536));
+    bool right = statesOf(*session) == "httppost qrs ";
+    const Dictionary payload = {{"text", std::string(200, 'x')}, {"number", 1}};
+    std::atomic<int> taken{-1};
+    std::thread sender([&] {
+      int sent = 0;
+      if (prctl(PR_SET_SECCOMP, SECCOMP_MODE_STRICT) == 0)
+        for (int i = 0; i < 1000; ++i) sent += session->sendMessage(1, 1, payload) ? 1 : 0;
+      taken = sent;
+      syscall(SYS_exit, 0);
+    });
+    right = right && eventually([&] { return taken == 1000; });
+    _exit(right ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+#endif
 
 // The library's first session, in a program that has no descriptor left just then.
 TEST_F(KYTReportingTest, WorksOnWhenThereWasNoDescriptorForItsWakeUp) {
