@@ -40,21 +40,22 @@ std::optional<std::string> makeMissingFolders(const Paths& paths) {
   return makeFolders(paths.userDefaults(), kPrivateFolder);
 }
 
-// Without it the daemon serves all the same: each line of the message log says what is wrong. Empty: no folder.
-std::string messageLogFolder(const Paths& paths, Log& log) {
-  const auto error = makeFolders(paths.messageLogs(), kPrivateFolder);
-  if (!error) return paths.messageLogs();
-  log.error("main: No message log: %s", error->c_str());
-  return {};
+// The folder in which the message log's lies, and is made again when it was removed. Where either cannot be made the daemon
+// serves all the same: each line of the message log says what is wrong. Empty: none.
+std::string folderOfMessageLogs(const Paths& paths, Log& log) {
+  const auto above = makeFolders(paths.systemLogs(), kPublicFolder);
+  const auto error = above ? above : makeFolders(paths.messageLogs(), kPrivateFolder);
+  if (error) log.error("main: No message log: %s", error->c_str());
+  return above ? std::string() : paths.systemLogs();
 }
 
-LinuxConfinement confinementOf(const Paths& paths, const Settings& settings, const std::string& messageLogs) {
+LinuxConfinement confinementOf(const Paths& paths, const Settings& settings, const std::string& logs) {
   return LinuxConfinement(paths.kytShare(),
                           {{"CONFIG", paths.configuration()},
                            {"SHARE", paths.kytShare()},
                            {"PLUGINS", paths.plugIns()},
                            {"STATE", paths.userDefaults()},
-                           {"LOGS", messageLogs},
+                           {"LOGS", logs},
                            {"RUN", paths.run()},
                            {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
 }
@@ -180,7 +181,7 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
 
-  const std::string messageLogs = messageLogFolder(paths, log);
+  const std::string logs = folderOfMessageLogs(paths, log);
 
   giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
@@ -191,7 +192,7 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
   log.normal("startLogging: Daemon starts logging...");
-  LinuxConfinement confinement = confinementOf(paths, settings, messageLogs);
+  LinuxConfinement confinement = confinementOf(paths, settings, logs);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   if (const auto error = confine(confinement)) {

@@ -23,7 +23,8 @@ struct Paths {
   [[nodiscard]] std::string userDefaults() const { return root + "/var/lib/kytreportingd/defaults"; }
   [[nodiscard]] std::string run() const { return root + "/run/kytreportingd"; }
   [[nodiscard]] std::string socket() const { return run() + "/com.vantu.kytreportingd"; }
-  [[nodiscard]] std::string messageLogs() const { return root + "/var/mobile/Library/Logs/Faultbin/Retired"; }
+  [[nodiscard]] std::string systemLogs() const { return root + "/var/mobile/Library/Logs/Faultbin"; }
+  [[nodiscard]] std::string messageLogs() const { return systemLogs() + "/Retired"; }
   [[nodiscard]] std::string plugIns() const { return root + "/System/Library/PrivateFrameworks"; }
   [[nodiscard]] std::string kytShare() const { return share + "/kytreporting"; }
   [[nodiscard]] std::string clientBundle() const { return kytShare() + "/KYTReporting.bundle"; }

@@ -12,6 +12,7 @@ TEST(Paths, StandBehindTheRoot) {
   EXPECT_EQ(paths.device(), "/tmp/demo/etc/kytreportingd/device.toml");
   EXPECT_EQ(paths.userDefaults(), "/tmp/demo/var/lib/kytreportingd/defaults");
   EXPECT_EQ(paths.socket(), "/tmp/demo/run/kytreportingd/com.vantu.kytreportingd");
+  EXPECT_EQ(paths.systemLogs(), "/tmp/demo/var/mobile/Library/Logs/Faultbin");
   EXPECT_EQ(paths.messageLogs(), "/tmp/demo/var/mobile/Library/Logs/Faultbin/Retired");
   EXPECT_EQ(paths.plugIns(), "/tmp/demo/System/Library/PrivateFrameworks");
   EXPECT_EQ(paths.clientBundle(), "/tmp/demo/usr/share/kytreporting/KYTReporting.bundle");

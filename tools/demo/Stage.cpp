@@ -151,6 +151,11 @@ std::optional<Error> Stage::handOverFolders() {
   std::error_code error;
   fs::create_directories(logs, error);
   if (error) return failure(logs + ": " + error.message());
+  const std::string above =
+      options_.folder + "/var/mobile/Library/Logs/Faultbin";  // the former is made again in it
+  if (chown(above.c_str(), static_cast<uid_t>(-1), options_.daemonUser->group) != 0 ||
+      chmod(above.c_str(), 01775) != 0)
+    return failure(above + ": " + std::strerror(errno));
   for (const std::string& own :
        {logs, state, state + "/com.vantu.diagnostics.toml", options_.folder + "/run/kytreportingd"}) {
     if (chown(own.c_str(), options_.daemonUser->user, options_.daemonUser->group) != 0)

@@ -3,12 +3,13 @@
 # the kernel ends it. Nothing switches this off.
 #
 # Files. Everything beneath a path of `read` may be read and listed; beneath a path of `write` files may also be made,
-# written, renamed and removed; beneath one of `sockets` sockets may be made and removed. Nothing may be executed. A path
-# of `read` that does not exist is left out; the others must exist. A variable stands only at the beginning:
+# written, renamed and removed; beneath one of `folders` folders may be made besides (not removed); beneath one of
+# `sockets` sockets may be made and removed. Nothing may be executed. A path of `read` that does not exist is left out; the
+# others must exist. A variable stands only at the beginning:
 #
 #   ${CONFIG}   /etc/kytreportingd            ${STATE}    /var/lib/kytreportingd/defaults
 #   ${SHARE}    <share>/kytreporting          ${RUN}      /run/kytreportingd
-#   ${PLUGINS}  /System/Library/PrivateFrameworks         ${LOGS}   /var/mobile/Library/Logs/Faultbin/Retired
+#   ${PLUGINS}  /System/Library/PrivateFrameworks         ${LOGS}   /var/mobile/Library/Logs/Faultbin
 #   ${CA}       the folder of tls.ca_file, when one is set
 #
 # Folders stand here rather than files: a file that is replaced by renaming another over it would be out of reach.
@@ -46,8 +47,13 @@ read = [
 
 write = [
   "${STATE}",
-  "${LOGS}",
   "/dev/null",
+]
+
+# The message log's folder lies in it: one that is made again after it was removed is another folder to the kernel, so what
+# is granted stands on the folder above.
+folders = [
+  "${LOGS}",
 ]
 
 sockets = [
@@ -103,7 +109,7 @@ allow = [
   # Files, where the paths above let it. Nothing is cut by opening it, which older kernels' Landlock would not stop
   "openat(*, *, no O_TRUNC)", "newfstatat", "fstat", "stat", "lstat", "statx", "access", "faccessat",
   "readlink", "readlinkat", "getdents64", "statfs", "fstatfs", "getcwd",
-  "mkdir", "mkdirat",                 # of a folder that is there, which it says; others Landlock refuses
+  "mkdir", "mkdirat",                 # the message log's folder; elsewhere Landlock refuses what is not there
   "rename", "renameat", "renameat2", "unlink", "unlinkat", "fsync", "fdatasync", "ftruncate", "flock",
   "fchmod", "fchown",
   "fcntl(*, F_GETFL)", "fcntl(*, F_SETFL)", "fcntl(*, F_GETFD)", "fcntl(*, F_SETFD)", "fcntl(*, F_DUPFD_CLOEXEC)",

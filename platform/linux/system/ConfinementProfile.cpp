@@ -33,6 +33,8 @@ class Parser {
         paths(key, node, profile_.read);
       } else if (key == "write") {
         paths(key, node, profile_.write);
+      } else if (key == "folders") {
+        paths(key, node, profile_.folders);
       } else if (key == "sockets") {
         paths(key, node, profile_.sockets);
       } else if (key == "limits") {

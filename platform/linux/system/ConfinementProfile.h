@@ -1,7 +1,8 @@
 // The profile of a confinement: what a process may do once it is confined, in one TOML file that people can
 // read. LinuxConfinement enters it.
 //
-//   read, write, sockets     folders and files; entries are absolute paths, or begin with a variable
+//   read, write, folders, sockets
+//                            folders and files; entries are absolute paths, or begin with a variable
 //                            ("${STATE}/…"), whose values the composition root knows
 //   [limits]                 address_space (bytes), descriptors, core (bytes); one that is missing stays as it is
 //   [system_calls]           otherwise: the error of a call that no list names, or "kill"
@@ -29,7 +30,7 @@ struct ResourceLimits {
 };
 
 struct ConfinementProfile {
-  std::vector<std::string> read, write, sockets;
+  std::vector<std::string> read, write, folders, sockets;
   ResourceLimits limits;
   SystemCallProfile systemCalls;
 };

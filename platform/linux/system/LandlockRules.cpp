@@ -29,6 +29,7 @@ struct RulesetAttributes {
 constexpr uint64_t kRead = LANDLOCK_ACCESS_FS_READ_FILE | LANDLOCK_ACCESS_FS_READ_DIR;
 constexpr uint64_t kWrite = kRead | LANDLOCK_ACCESS_FS_WRITE_FILE | LANDLOCK_ACCESS_FS_REMOVE_FILE |
                             LANDLOCK_ACCESS_FS_MAKE_REG | kTruncate;
+constexpr uint64_t kFolders = kWrite | LANDLOCK_ACCESS_FS_MAKE_DIR;
 constexpr uint64_t kSockets = kRead | LANDLOCK_ACCESS_FS_REMOVE_FILE | LANDLOCK_ACCESS_FS_MAKE_SOCK;
 // A rule for something else than a folder may name only these.
 constexpr uint64_t kOfFiles = LANDLOCK_ACCESS_FS_EXECUTE | LANDLOCK_ACCESS_FS_WRITE_FILE |
@@ -97,8 +98,10 @@ std::variant<LandlockRules, std::string> LandlockRules::of(const ConfinementProf
     const std::vector<std::string>& paths;
     uint64_t rights;
     bool mayBeMissing;
-  } kinds[] = {
-      {profile.read, kRead, true}, {profile.write, kWrite, false}, {profile.sockets, kSockets, false}};
+  } kinds[] = {{profile.read, kRead, true},
+               {profile.write, kWrite, false},
+               {profile.folders, kFolders, false},
+               {profile.sockets, kSockets, false}};
   for (const auto& kind : kinds) {
     for (const std::string& path : kind.paths) {
       if (auto error = allow(rules.ruleset_.get(), path, kind.rights & known, kind.mayBeMissing))

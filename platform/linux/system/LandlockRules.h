@@ -1,9 +1,10 @@
 // What a confined process may do with files, and with what lies outside of it, by Landlock.
 //
 // Everything beneath `read` may be read and listed; beneath `write` also written, created, renamed and
-// removed (files, not folders); beneath `sockets` sockets may be made and removed; nothing may be executed,
-// linked into other folders or made a device, and nowhere else a socket. A path of `read` that does not exist
-// is left out, the others must exist. Files that are open before stay usable.
+// removed (files, not folders); beneath `folders` the same, and folders may be made; beneath `sockets` sockets
+// may be made and removed; nothing may be executed, linked into other folders or made a device, and nowhere
+// else a socket. A path of `read` that does not exist is left out, the others must exist. Files that are open
+// before stay usable.
 //
 // As far as the kernel can, besides: no TCP port is bound (connecting is free, since storebags decide the
 // addresses), and no process outside is signalled or reached by an abstract Unix socket.

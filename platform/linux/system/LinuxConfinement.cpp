@@ -104,6 +104,7 @@ std::vector<std::string> LinuxConfinement::openPaths(std::string_view profileNam
   if (profile == nullptr) return {};
   std::vector<std::string> paths = profile->read;
   paths.insert(paths.end(), profile->write.begin(), profile->write.end());
+  paths.insert(paths.end(), profile->folders.begin(), profile->folders.end());
   paths.insert(paths.end(), profile->sockets.begin(), profile->sockets.end());
   return paths;
 }

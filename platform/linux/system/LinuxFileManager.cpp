@@ -15,8 +15,8 @@ namespace kyt {
 
 namespace {
 
-constexpr uint32_t kFolderMode = 0755;
-constexpr mode_t kFileMode = 0600;  // what back ends answered shows what clients sent
+constexpr uint32_t kFolderMode = 0750;  // what was sent is nobody else's
+constexpr mode_t kFileMode = 0600;      // what back ends answered shows what clients sent
 
 struct CloseFolder {
   void operator()(DIR* folder) const { ::closedir(folder); }

@@ -78,6 +78,15 @@ TEST(ConfinementProfile, AnEntryOfAnEmptyVariableFallsAway) {
   EXPECT_TRUE(profile.write.empty());
 }
 
+TEST(ConfinementProfile, HoldsThePathsOfEachKind) {
+  const auto profile =
+      parsed(std::string("read = ['/r']\nwrite = ['/w']\nfolders = ['/f']\nsockets = ['/s']\n") + kNoCalls);
+  EXPECT_EQ(profile.read, std::vector<std::string>{"/r"});
+  EXPECT_EQ(profile.write, std::vector<std::string>{"/w"});
+  EXPECT_EQ(profile.folders, std::vector<std::string>{"/f"});
+  EXPECT_EQ(profile.sockets, std::vector<std::string>{"/s"});
+}
+
 TEST(ConfinementProfile, HoldsItsLimitsAndLists) {
   const auto profile = parsed(
       "[limits]\naddress_space = 4_096\ncore = 0\n[system_calls]\notherwise = 'kill'\nallow = ['read']\n"

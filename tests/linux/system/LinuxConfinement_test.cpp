@@ -230,6 +230,15 @@ TEST_F(LinuxConfinementTest, TheShippedProfileLetsTheDaemonWorkWithFilesAndNoMor
                 wrong += expectError(name, openError(file, O_RDWR), 0);
                 wrong += expectError(name, errorOf(::unlink(file.c_str())), 0);
               }
+              const std::string again = folder_ / "logs/again";
+              wrong += expectError("a log's folder", errorOf(::mkdir(again.c_str(), 0750)), 0);
+              wrong += expectError("a file in it", openError(again + "/file", O_RDWR | O_CREAT), 0);
+              wrong += expectError("the file", errorOf(::unlink((again + "/file").c_str())), 0);
+              wrong += expectError("the folder", errorOf(::unlinkat(AT_FDCWD, again.c_str(), AT_REMOVEDIR)),
+                                   EACCES);
+              wrong += expectError(
+                  "a folder in the state",
+                  errorOf(::mkdir((folder_ / "var/lib/kytreportingd/defaults/x").c_str(), 0750)), EACCES);
               for (const char* file :
                    {"/etc/passwd", "/proc/self/status", "/proc/self/smaps_rollup", "/dev/urandom"}) {
                 wrong += expectError(file, openError(file, O_RDONLY), 0);
