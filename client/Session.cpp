@@ -14,7 +14,8 @@ namespace {
 using std::chrono::milliseconds;
 using Steady = std::chrono::steady_clock;
 
-constexpr size_t kMaxOverflow = 4096;  // commands
+constexpr size_t kMaxOverflow = 4096;                          // commands
+constexpr milliseconds kLongestWait = std::chrono::years(50);  // a clock's nanoseconds end soon after 200
 
 std::string problemOf(const Dictionary& sessionInfo) {
   const std::optional<Error> error = KYTReporting::checkSessionInfo(sessionInfo);
@@ -37,7 +38,7 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
       path_(std::move(options.socketPath)),
       single_(single),
       maxQueuedBytes_(std::max<size_t>(options.maxQueuedBytes, 4096)),
-      callDeadline_(options.callDeadline),
+      callDeadline_(std::min(options.callDeadline, kLongestWait)),
       finishWaitsForDaemon_(options.finishWaitsForDaemon),
       loop_(loop),
       ring_(std::clamp<size_t>(options.maxQueuedMessages, 64, 65536)),
@@ -157,7 +158,8 @@ bool Session::finishAndWait(milliseconds timeout) {
   if (loop_->isCurrentThread()) return false;
   loop_->wake();  // without a daemon it gives up at once
   std::unique_lock<std::mutex> lock(stateMutex_.native());
-  stateChanged_.wait_for(lock, timeout, [this]() NO_THREAD_SAFETY_ANALYSIS { return goodbyeOver_; });
+  stateChanged_.wait_for(lock, std::min(timeout, kLongestWait),
+                         [this]() NO_THREAD_SAFETY_ANALYSIS { return goodbyeOver_; });
   return [this]() NO_THREAD_SAFETY_ANALYSIS { return finished_; }();
 }
 
@@ -181,7 +183,7 @@ void Session::becomeInert() {
 }
 
 void Session::end(ClientError code, const std::string& reason) {
-  if (done_) return;
+  if (done_) return failAll({}, code, reason);
   done_ = true;
   closed_ = true;
   connected_ = false;
@@ -204,12 +206,24 @@ void Session::end(ClientError code, const std::string& reason) {
   standing_.sayDrops(statistics());
   standing_.announce();
   standing_.dropBlock();
-  for (const auto& command : commands) command->fail(code, reason);
+  failAll(std::move(commands), code, reason);
   aggregationBlock_ = nullptr;
   MutexLock lock(stateMutex_);
   goodbyeOver_ = true;
   ended_ = true;
   stateChanged_.notify_all();
+}
+
+// A completion may close the session: then the others have run before close() returns, and not with what the program
+// has freed by then.
+void Session::failAll(std::vector<std::unique_ptr<Command>> commands, ClientError code,
+                      const std::string& reason) {
+  for (auto& command : commands) failing_.push_back({std::move(command), code, reason});
+  while (!failing_.empty()) {
+    const Failing failing = std::move(failing_.front());
+    failing_.pop_front();
+    failing.command->fail(failing.code, failing.reason);
+  }
 }
 
 bool Session::nextItem(Item& item) {
@@ -251,7 +265,9 @@ void Session::expire(SteadyTime now) {
   if (late.empty()) return;
   waitedTooLong_.fetch_add(late.size());
   const std::string reason = "no daemon within " + secondsText(callDeadline_) + ": " + standing_.why();
-  for (const auto& command : late) command->fail(ClientError::timedOut, reason);
+  failAll(std::move(late), ClientError::timedOut, reason);
+  // Nothing is left of it but a connection, which would keep the daemon from its idle end.
+  if (single_) end(ClientError::timedOut, reason);
 }
 
 }  // namespace kyt::client

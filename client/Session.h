@@ -93,6 +93,7 @@ class Session {
   bool move(SteadyTime now);
   void disconnected(SteadyTime now, std::string reason);
   [[nodiscard]] bool givesUp() const;
+  void failAll(std::vector<std::unique_ptr<Command>> commands, ClientError code, const std::string& reason);
   void expire(SteadyTime now);
   bool drain();
   void drainMessage(const Item& item);
@@ -164,6 +165,12 @@ class Session {
   size_t outAt_ = 0;
   std::deque<Mark> marks_;
   std::deque<Pending> pending_;
+  struct Failing {
+    std::unique_ptr<Command> command;
+    ClientError code;
+    std::string reason;
+  };
+  std::deque<Failing> failing_;  // whose completions run now
   uint32_t serial_ = 0;
   struct Unacknowledged {
     uint32_t serial;

@@ -139,9 +139,10 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   lost_.fetch_add(lost);
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   nextAttempt_ = now + backoff_;
-  std::deque<Pending> pending;
-  pending.swap(pending_);
-  for (Pending& entry : pending) entry.command->fail(ClientError::notConnected, reason);
+  std::vector<std::unique_ptr<Command>> unanswered;
+  for (Pending& entry : pending_) unanswered.push_back(std::move(entry.command));
+  pending_.clear();
+  failAll(std::move(unanswered), ClientError::notConnected, reason);
   if (ending_ || (single_ && (taken || refused))) end(ClientError::notConnected, reason);
 }
 
