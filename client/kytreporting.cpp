@@ -42,7 +42,9 @@ std::optional<Dictionary> optional(const kyt_dictionary* dictionary) {
 
 KYTReporting::Options optionsOf(const kyt_options& given) {
   kyt_options known{};
-  std::memcpy(&known, &given, given.size < sizeof known ? given.size : sizeof known);
+  // Whole fields alone: half a pointer points nowhere.
+  const size_t size = given.size / alignof(kyt_options) * alignof(kyt_options);
+  std::memcpy(&known, &given, std::min(size, sizeof known));
   KYTReporting::Options options;
   if (known.socket_path != nullptr) options.socketPath = known.socket_path;
   if (known.session_info != nullptr) options.sessionInfo = known.session_info->value;

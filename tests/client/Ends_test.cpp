@@ -4,10 +4,12 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <cstddef>
 #include <future>
 #include <thread>
 
 #include "kytreporting/KYTReporting.h"
+#include "kytreporting/kytreporting.h"
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
@@ -130,6 +132,19 @@ TEST_F(ClientEnds, TheLongestTimesThatThereAreDoNotEndAtOnce) {
   EXPECT_EQ(answerOf(flushed), "Nothing to flush");
   EXPECT_TRUE(answerOf(finished));
   finishing.join();
+}
+
+TEST_F(ClientEnds, OptionsOfASizeThatCutsAFieldAreReadWithoutIt) {
+  ASSERT_TRUE(daemon_.start());
+  kyt_options options{};
+  options.socket_path = socket_.c_str();
+  options.on_state_change = [](kyt_state, const char*, void*) { ADD_FAILURE() << "not within the size"; };
+  for (const size_t cut : {size_t{1}, size_t{4}, size_t{7}}) {
+    options.size = offsetof(kyt_options, on_state_change) + cut;
+    kyt_session* session = kyt_session_open(&options);
+    EXPECT_EQ(kyt_session_finish(session, 20000), 1);
+    kyt_session_close(session);
+  }
 }
 
 }  // namespace
