@@ -28,6 +28,7 @@
 namespace kyt {
 
 class SerialQueue;
+class UserAccount;
 struct Platform;
 
 // Two numbers that would otherwise be mistaken for each other in the send operations.
@@ -67,6 +68,8 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] String convertIntoSHA256(const String& text) const;
 
   virtual void cleanup();
+  // Of the user whose events these are: what is kept for them counts there. Before the first event.
+  void setUserAccount(std::shared_ptr<UserAccount> account) { userAccount_ = std::move(account); }
   void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> delegate);
   // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
   void setSelfVersion(const String& version);
@@ -190,6 +193,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::optional<Array> eventWhitelist_, eventBlacklist_;
   std::optional<Data> digestKey_;
   int32_t digestAlgorithm_ = 0;
+  std::shared_ptr<UserAccount> userAccount_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 };
 

@@ -71,7 +71,9 @@ class Bench {
     options.share = share_;
     options.internalBuild = true;
     options.consent = false;
-    options.extraSettings = "[limits]\nmax_connections_per_user = 16384\nmax_batch_bytes = 1073741824\n";
+    options.extraSettings =
+        "[limits]\nmax_connections_per_user = 16384\nmax_batch_bytes = 1073741824\n"
+        "max_bytes_per_user = 17179869184\nmax_descriptors_per_user = 1048576\n";
     auto made = Stage::make(std::move(options));
     if (auto* error = std::get_if<Error>(&made)) {
       std::fprintf(stderr, "bench: %s\n", error->localizedDescription.c_str());

@@ -13,6 +13,7 @@
 #include "platform/Entitlements.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
+#include "platform/UserBudget.h"
 #include "platform/Value.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
@@ -230,6 +231,7 @@ class Delegate final : public ListenerDelegate {
 
 void ServeEventCall(benchmark::State& state) {
   const Limits limits;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 65536));
   Counters counters;
   MemoryLogSink sink;
   Log log(sink);
@@ -243,7 +245,7 @@ void ServeEventCall(benchmark::State& state) {
   auto acceptor = std::make_unique<MemoryAcceptor>();
   acceptor->waiting.push_back(std::make_unique<MemoryStream>(pipe, 7));
   DBusServer server(
-      {limits, counters, log, clock, timers, executor, reactor, entitlements, std::string(32, 'f')},
+      {limits, counters, log, clock, timers, executor, reactor, entitlements, budget, std::string(32, 'f')},
       std::move(acceptor));
   server.setDelegate(delegate);
   server.resume();

@@ -28,7 +28,7 @@ Pipeline::Pipeline() {
   acceptor->waiting.push_back(std::make_unique<MemoryStream>(pipe_, kDescriptor));
   server_ = std::make_unique<DBusServer>(
       DBusServerServices{test_.limits, test_.counters, test_.log, test_.clock, test_.timers, test_.executor,
-                         test_.reactor, entitlements_, std::string(32, 'f')},
+                         test_.reactor, entitlements_, test_.budget, std::string(32, 'f')},
       std::move(acceptor));
   server_->setDelegate(*this);
   server_->resume();

@@ -20,6 +20,7 @@
 #include "platform/linux/system/Files.h"
 #include "platform/linux/system/LinuxConfinement.h"
 #include "platform/linux/system/LogSinks.h"
+#include "platform/linux/system/MachineResources.h"
 #include "platform/linux/system/Process.h"
 #include "platform/linux/system/ProgramInspector.h"
 #include "platform/linux/system/ServiceManager.h"
@@ -123,8 +124,8 @@ int waitForTheEnd(StopSignals& signals, Log& log) {
 }
 
 int serve(const Settings& settings, const Paths& paths, Log& log, Counters& counters,
-          ProgramInspector& inspector, const DeletionBroker* broker, Confinement& confinement,
-          StopSignals& stopSignals) {
+          ProgramInspector& inspector, const DeletionBroker* broker, uint64_t memory,
+          Confinement& confinement, StopSignals& stopSignals) {
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -143,7 +144,8 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
   }
   log.allowThreads();
   DaemonServices services({settings, paths, log, counters, inspector, broker, std::move(reactor),
-                           std::move(acceptor), activated, [&stopSignals] { stopSignals.request(); }});
+                           std::move(acceptor), activated, memory, LinuxConfinement::descriptorLimit(),
+                           [&stopSignals] { stopSignals.request(); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
@@ -195,6 +197,7 @@ int runDaemon(const DaemonOptions& options) {
   LinuxConfinement confinement = confinementOf(paths, settings, logs);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
+  const uint64_t memory = memoryForTheDaemon();
   if (const auto error = confine(confinement)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
@@ -202,7 +205,7 @@ int runDaemon(const DaemonOptions& options) {
   logWhatIsNotEnforced(confinement, log);
   log.debug("main: At most %llu descriptors",
             static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
-  return serve(settings, paths, log, counters, *inspector, broker.get(), confinement, stopSignals);
+  return serve(settings, paths, log, counters, *inspector, broker.get(), memory, confinement, stopSignals);
 }
 
 }  // namespace kyt

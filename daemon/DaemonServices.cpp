@@ -93,6 +93,7 @@ DaemonServices::DaemonServices(Start start)
       log_(start.log),
       counters_(start.counters),
       idle_(std::move(start.idle)),
+      budget_(UserShares::of(settings_.limits, start.memory, start.descriptors)),
       reactor_(std::move(start.reactor)),
       workers_(workerPoolOptions(counters_, log_)),
       userDefaults_({start.paths.userDefaults()}, log_, counters_, clock_),
@@ -102,14 +103,14 @@ DaemonServices::DaemonServices(Start start)
       daemonBundle_(start.paths.daemonBundle(), log_),
       entitlements_(entitlementsOptions(start.paths), start.inspector, log_, counters_, clock_),
       urlSessions_(urlSessionOptions(settings_), log_, counters_),
-      fileExtensions_(start.broker, log_, counters_),
+      fileExtensions_(start.broker, log_, counters_, budget_),
       pluginBundles_(start.paths.root, log_),
       powerLog_(counters_),
       platform_{settings_.limits, counters_,      log_,           clock_,        *reactor_,
                 *reactor_,        workers_,       random_,        userDefaults_, deviceProperties_,
                 consent_,         cryptography_,  propertyLists_, json_,         deflate_,
                 memory_,          urlSessions_,   udpSockets_,    clientBundle_, daemonBundle_,
-                fileExtensions_,  pluginBundles_, powerLog_},
+                fileExtensions_,  pluginBundles_, powerLog_,      budget_},
       deviceIdentity_(platform_),
       environment_(platform_, deviceIdentity_,
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
@@ -123,7 +124,7 @@ DaemonServices::DaemonServices(Start start)
                    [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),
       listener_(DBusServerServices{settings_.limits, counters_, log_, clock_, *reactor_, workers_, *reactor_,
-                                   entitlements_, wireMachineId(deviceIdentity_, cryptography_)},
+                                   entitlements_, budget_, wireMachineId(deviceIdentity_, cryptography_)},
                 std::move(start.acceptor)) {
   listener_.setDelegate(agent_);
 }

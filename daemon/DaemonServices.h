@@ -22,6 +22,7 @@
 #include "platform/Platform.h"
 #include "platform/SerialQueue.h"
 #include "platform/Settings.h"
+#include "platform/UserBudget.h"
 #include "platform/WorkerPool.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/linux/LinuxMemoryInfo.h"
@@ -63,6 +64,8 @@ class DaemonServices {
     std::unique_ptr<EpollReactor> reactor;
     std::unique_ptr<StreamAcceptor> acceptor;
     bool socketActivated = false;
+    uint64_t memory = 0;       // bytes and
+    uint64_t descriptors = 0;  // descriptors that the daemon may use, for the shares of users
     // The daemon has been idle for long enough and nothing is outstanding. Any thread.
     std::function<void()> idle;
   };
@@ -92,6 +95,7 @@ class DaemonServices {
   Log& log_;
   Counters& counters_;
   const std::function<void()> idle_;
+  UserBudget budget_;
   LinuxClock clock_;
   std::unique_ptr<EpollReactor> reactor_;
   WorkerPool workers_;

@@ -19,7 +19,7 @@ ReportingdAgent::ReportingdAgent(Configuration configuration, StorebagFetcher& f
       fetcher_(fetcher),
       class_(sessionClass),
       transaction_(transaction),
-      _sharedData(configuration.platform.limits.maxSharedDataBytesPerUser) {}
+      _sharedData(configuration.platform.budget) {}
 
 ReportingdAgent::~ReportingdAgent() = default;
 

@@ -119,7 +119,6 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   std::optional<uint32_t> cachedStorebagsSize_ GUARDED_BY(monitor_);  // the estimate, until the cache changes
   std::map<std::string, HierarchyGroup, std::less<>> _correlatedSessions GUARDED_BY(monitor_);
   std::unordered_map<const ReportingdSession*, Registration> registrations_ GUARDED_BY(monitor_);
-  std::map<uint32_t, uint64_t> tokensOfUser_ GUARDED_BY(monitor_);
   SharedDataStore _sharedData GUARDED_BY(monitor_);
   bool transactionOpen_ GUARDED_BY(monitor_) = false;
 

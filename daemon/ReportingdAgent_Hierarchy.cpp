@@ -8,6 +8,7 @@
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/UserBudget.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {
@@ -34,16 +35,25 @@ void ReportingdAgent::removeFromGroups(ReportingdSession& session) {
 // Arrays of tokens stay for the life of the process, so the tokens that one user's sessions bring are
 // limited.
 bool ReportingdAgent::addGroup(const String& token, ReportingdSession& session) {
+  constexpr uint64_t kGroupBytes = 512;
   Platform& platform = configuration_.platform;
-  uint64_t& tokens = tokensOfUser_[session.peerUser()];
-  if (tokens >= platform.limits.maxHierarchyTokensPerUser) {
+  const std::shared_ptr<UserAccount> account = platform.budget.account(session.peerUser());
+  if (!account->take(Share::hierarchyTokens, 1)) {
     if (platform.counters.addAndMayLog(Reason::hierarchyTokenRefused, platform.clock.monotonic()))
       platform.log.error(
           "updateCorrelatedSessions: User %u has %llu hierarchy tokens, the most allowed: session %u counts as standalone",
-          session.peerUser(), static_cast<unsigned long long>(tokens), session.sessionID());
+          session.peerUser(), static_cast<unsigned long long>(account->holds(Share::hierarchyTokens)),
+          session.sessionID());
     return false;
   }
-  ++tokens;
+  if (!account->take(Share::bytes, kGroupBytes + token.size(), kLeftForMessages)) {
+    account->giveBack(Share::hierarchyTokens, 1);
+    if (platform.counters.addAndMayLog(Reason::userBytesExceeded, platform.clock.monotonic()))
+      platform.log.error(
+          "updateCorrelatedSessions: User %u holds too many bytes for another hierarchy token: session %u counts as standalone",
+          session.peerUser(), session.sessionID());
+    return false;
+  }
   _correlatedSessions[token.str()];
   tokenCount_.store(_correlatedSessions.size(), std::memory_order_relaxed);
   return true;

@@ -35,19 +35,18 @@ bool SharedDataStore::update(const String& token, const Dictionary& sharedData, 
     if (charge != existing->second.charges.end() && charge->second.user == user)
       credited += charge->second.bytes;
   }
-  if (bytesOfUser(user) - credited + added > maxBytesPerUser_) return false;
+  const std::shared_ptr<UserAccount> account = budget_.account(user);
+  if (!take(*account, added, credited)) return false;
 
   Shared& shared = byToken_[token.str()];
   if (shared.token.bytes == 0) {
     shared.token = Charge{user, kEntryBytes + token.size()};
-    bytesOfUser_[user] += shared.token.bytes;
   }
   for (const DictionaryEntry& entry : sharedData) {
     shared.values.set(entry.key, entry.value);
     Charge& charge = shared.charges[entry.key.str()];
     credit(charge);
     charge = Charge{user, entryBytes(entry.key, entry.value)};
-    bytesOfUser_[user] += charge.bytes;
   }
   return true;
 }
@@ -77,13 +76,27 @@ std::optional<Dictionary> SharedDataStore::dictionary(const String& token) const
 }
 
 uint64_t SharedDataStore::bytesOfUser(uint32_t user) const {
-  const auto bytes = bytesOfUser_.find(user);
-  return bytes == bytesOfUser_.end() ? 0 : bytes->second;
+  return budget_.account(user)->holds(Share::sharedDataBytes);
+}
+
+// Room for `added` bytes once `credited` are given back, which credit() does.
+bool SharedDataStore::take(UserAccount& account, uint64_t added, uint64_t credited) {
+  account.giveBack(Share::sharedDataBytes, credited);
+  const bool fits = account.take(Share::sharedDataBytes, added);
+  account.takeAnyway(Share::sharedDataBytes, credited);
+  if (!fits) return false;
+  account.giveBack(Share::bytes, credited);
+  const bool hasMemory = account.take(Share::bytes, added, kLeftForMessages);
+  account.takeAnyway(Share::bytes, credited);
+  if (!hasMemory) account.giveBack(Share::sharedDataBytes, added);
+  return hasMemory;
 }
 
 void SharedDataStore::credit(const Charge& charge) {
   if (charge.bytes == 0) return;
-  bytesOfUser_[charge.user] -= charge.bytes;
+  const std::shared_ptr<UserAccount> account = budget_.account(charge.user);
+  account->giveBack(Share::sharedDataBytes, charge.bytes);
+  account->giveBack(Share::bytes, charge.bytes);
 }
 
 }  // namespace kyt

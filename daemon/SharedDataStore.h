@@ -9,13 +9,14 @@
 #include <optional>
 #include <string>
 
+#include "platform/UserBudget.h"
 #include "platform/Value.h"
 
 namespace kyt {
 
 class SharedDataStore {
  public:
-  explicit SharedDataStore(uint64_t maxBytesPerUser) : maxBytesPerUser_(maxBytesPerUser) {}
+  explicit SharedDataStore(UserBudget& budget) : budget_(budget) {}
 
   // Merges the entries in; false when they would pass the user's limit (nothing is changed then).
   [[nodiscard]] bool update(const String& token, const Dictionary& sharedData, uint32_t user);
@@ -36,10 +37,10 @@ class SharedDataStore {
     std::map<std::string, Charge, std::less<>> charges;
   };
   void credit(const Charge& charge);
+  [[nodiscard]] static bool take(UserAccount& account, uint64_t added, uint64_t credited);
 
-  const uint64_t maxBytesPerUser_;
+  UserBudget& budget_;
   std::map<std::string, Shared, std::less<>> byToken_;
-  std::map<uint32_t, uint64_t> bytesOfUser_;
 };
 
 }  // namespace kyt

@@ -11,6 +11,7 @@
 #include "platform/Entitlements.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
+#include "platform/UserBudget.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
@@ -87,6 +88,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   constexpr int kStream = 7;
   Limits limits;
   limits.maxMessageBytes = 65536;
+  limits.maxBytesPerUser = 2u << 20;
+  UserBudget budget(UserShares::of(limits, 0, 65536));
   Counters counters;
   MemoryLogSink sink;
   Log log(sink, LogLevel::debug);
@@ -101,7 +104,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   auto acceptor = std::make_unique<MemoryAcceptor>();
   acceptor->waiting.push_back(std::make_unique<MemoryStream>(pipe, kStream));
   DBusServer server(
-      {limits, counters, log, clock, timers, executor, reactor, entitlements, std::string(32, 'f')},
+      {limits, counters, log, clock, timers, executor, reactor, entitlements, budget, std::string(32, 'f')},
       std::move(acceptor));
   server.setDelegate(delegate);
   server.resume();

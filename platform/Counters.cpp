@@ -20,12 +20,18 @@ const char* reasonName(Reason reason) {
       return "handshake-failed";
     case Reason::handshakeTimedOut:
       return "handshake-timed-out";
+    case Reason::messageTimedOut:
+      return "message-timed-out";
     case Reason::messageTooLong:
       return "message-too-long";
     case Reason::tooManyConnections:
       return "too-many-connections";
     case Reason::tooManyConnectionsOfUser:
       return "too-many-connections-of-user";
+    case Reason::tooManyDescriptorsOfUser:
+      return "too-many-descriptors-of-user";
+    case Reason::userBytesExceeded:
+      return "user-bytes-exceeded";
     case Reason::queuedBytesExceeded:
       return "queued-bytes-exceeded";
     case Reason::clientNotReading:
@@ -60,6 +66,8 @@ const char* reasonName(Reason reason) {
       return "datagram-given-up";
     case Reason::batchFull:
       return "batch-full";
+    case Reason::userBatchesFull:
+      return "user-batches-full";
     case Reason::consentMissing:
       return "consent-missing";
     case Reason::countryNotListed:

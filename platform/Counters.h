@@ -26,9 +26,12 @@ enum class Reason : uint8_t {
   acceptFailed,        // times that the system refused to watch the listening socket, or to accept
   handshakeFailed,
   handshakeTimedOut,
+  messageTimedOut,  // … or for a message of which the rest does not come
   messageTooLong,
   tooManyConnections,
   tooManyConnectionsOfUser,
+  tooManyDescriptorsOfUser,  // a connection refused, or ended with those that its message brought
+  userBytesExceeded,    // a connection or hierarchy token that its user's share of memory has no room for
   queuedBytesExceeded,  // reading from a client stopped
   clientNotReading,     // … and its connection ended
   aggregatorMessageDropped,
@@ -46,6 +49,7 @@ enum class Reason : uint8_t {
   datagramUnacknowledged,    // … after its last retransmission
   datagramGivenUp,           // … with its back end
   batchFull,                 // an event dropped because its back end's batch is full
+  userBatchesFull,           // … because its user's share of memory is
   // Decisions that a back end posts nothing, or nothing for now; the events count where they are dropped.
   consentMissing,
   countryNotListed,

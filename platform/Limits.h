@@ -4,6 +4,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 
 namespace kyt {
 
@@ -17,8 +18,13 @@ struct Limits {
   uint64_t maxBatchBytes = 16777216;      // one back end's batch; then new events are dropped
   uint64_t maxHierarchyTokensPerUser = 4096;      // tokens' arrays stay for the life of the process
   uint64_t maxSharedDataBytesPerUser = 16777216;  // so does their shared data
-  double idleExitSeconds = 30;                    // socket-activated and without a session
-  double shutdownGraceSeconds = 5;                // from SIGTERM to cancelling what is left
+  // Of one user's clients together; without a value a part of the memory and the descriptors there are
+  // (platform/UserBudget.h).
+  std::optional<uint64_t> maxBytesPerUser;           // memory, but for files that are uploaded
+  std::optional<uint64_t> maxUploadingBytesPerUser;  // files, read and not yet answered
+  std::optional<uint64_t> maxDescriptorsPerUser;     // connections, and what came with unfinished messages
+  double idleExitSeconds = 30;                       // socket-activated and without a session
+  double shutdownGraceSeconds = 5;                   // from SIGTERM to cancelling what is left
 
   friend bool operator==(const Limits&, const Limits&) = default;
 
@@ -31,14 +37,14 @@ struct Limits {
   static constexpr double requestSeconds = 300;
   static constexpr size_t leastBodyBytesPerSecond = 2048;
   static constexpr size_t maxPropertyListTags = 131072;  // each takes up to 128 bytes while it is read
-  static constexpr size_t maxWaitingBytes =
-      16u << 20;  // request bodies waiting for connectivity, each URL session
-  // Requests started and not completed, each URL session: a server that answers slowly, or never, cannot make a
-  // fast client fill the memory.
+  // Requests waiting for connectivity, each user's in each URL session.
+  static constexpr size_t maxWaitingBytes = 16u << 20;
+  // Requests started and not completed, each user's in each URL session: a server that answers slowly, or never, cannot
+  // make a fast client fill the memory.
   static constexpr size_t maxOutstandingBytes = 64u << 20;
-  // Of one user's files, read and not yet answered: each of a user's many sessions may upload at the same time.
-  // One file is always taken.
-  static constexpr uint64_t maxUploadingBytesPerUser = 256u << 20;
+  // Of one user's files, read and not yet answered, however much memory there is: each of a user's many sessions may
+  // upload at the same time.
+  static constexpr uint64_t maxUploadingBytes = 256u << 20;
   // Requests on their way at once, all sessions; further ones wait in line. Each has a connection of some 45 KiB and a
   // descriptor, and clients that come and go start them faster than servers answer.
   static constexpr size_t maxActiveRequests = 1024;
@@ -46,7 +52,13 @@ struct Limits {
   static constexpr size_t maxWorkers = 512;                    // threads
   static constexpr size_t maxHandshakeBytes = 16384;           // before authentication
   static constexpr double handshakeSeconds = 30;
+  static constexpr double messageSeconds = 30;  // once begun; it keeps memory and descriptors until its end
   static constexpr size_t maxDescriptorsPerMessage = 16;
+  static constexpr size_t connectionBytes =
+      32768;  // what a connection and its session count, before they hold anything
+  static constexpr size_t socketBytes =
+      212992;  // … and more, while its client lets the socket's buffer be full
+  static constexpr size_t freeBytes = 4096;         // what each may hold besides: counted with the connection
   static constexpr unsigned turnCalls = 256;        // a connection hands its worker back after so many calls
   static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
   static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them

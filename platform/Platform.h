@@ -24,6 +24,7 @@ class Reactor;
 class TimerService;
 class UDPSocketFactory;
 class URLSessionFactory;
+class UserBudget;
 class UserDefaults;
 struct Limits;
 
@@ -51,6 +52,7 @@ struct Platform {
   FileExtensions& fileExtensions;
   PluginBundles& pluginBundles;
   PowerLog& powerLog;
+  UserBudget& budget;
 };
 
 }  // namespace kyt

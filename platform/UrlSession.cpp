@@ -4,6 +4,7 @@
 #include <cctype>
 
 #include "platform/Limits.h"
+#include "platform/UserBudget.h"
 
 namespace kyt {
 
@@ -26,12 +27,35 @@ size_t OutstandingBytes::of(const URLRequest& request) {
   return std::min(bytes, Limits::maxOutstandingBytes / 2);
 }
 
-bool OutstandingBytes::take(size_t bytes) {
+OutstandingBytes::~OutstandingBytes() {
+  for (User* user = first_.load(); user != nullptr;) delete std::exchange(user, user->next_);
+}
+
+OutstandingBytes::User& OutstandingBytes::user(const std::shared_ptr<UserAccount>& account) {
+  User* first = first_.load(std::memory_order_acquire);
+  std::unique_ptr<User> made;
+  for (;;) {
+    for (User* user = first; user != nullptr; user = user->next_)
+      if (user->account_ == account) return *user;
+    if (!made) made = std::make_unique<User>(account);
+    made->next_ = first;
+    if (first_.compare_exchange_weak(first, made.get(), std::memory_order_acq_rel)) return *made.release();
+  }
+}
+
+bool OutstandingBytes::User::take(size_t bytes) {
   size_t before = bytes_.load(std::memory_order_relaxed);
   do {
     if (before + bytes > Limits::maxOutstandingBytes) return false;
   } while (!bytes_.compare_exchange_weak(before, before + bytes, std::memory_order_relaxed));
-  return true;
+  if (!account_ || account_->take(Share::bytes, bytes, 2 * kLeftForMessages)) return true;
+  bytes_.fetch_sub(bytes, std::memory_order_relaxed);
+  return false;
+}
+
+void OutstandingBytes::User::giveBack(size_t bytes) {
+  bytes_.fetch_sub(bytes, std::memory_order_relaxed);
+  if (account_) account_->giveBack(Share::bytes, bytes);
 }
 
 }  // namespace kyt

@@ -23,6 +23,8 @@
 
 namespace kyt {
 
+class UserAccount;
+
 // The domain of transport failures; the code is libcurl's (CURLcode), or one of those below.
 inline constexpr char kKYTURLErrorDomain[] = "KYTURLErrorDomain";
 inline constexpr int32_t kURLErrorCancelled = -999;            // the session was cancelled (shut-down)
@@ -39,7 +41,8 @@ struct URLRequest {
   bool allowsCellularAccess = true;
   bool isAwaited =
       false;  // a thread does nothing else until it completes; see URLSessionFactory::cancelAwaited
-  int maxRedirects = 0;  // followed only while they stay on https
+  std::shared_ptr<UserAccount> account;  // of the client's user; null: the daemon's own request
+  int maxRedirects = 0;                  // followed only while they stay on https
 };
 
 struct URLResponse {
@@ -60,19 +63,36 @@ struct URLSessionConfiguration {
       false;  // a request that cannot leave (no route, no resolver) waits for the network
 };
 
-// What the requests of one session that have not completed count towards `Limits::maxOutstandingBytes`, for those who
-// implement the port. Any thread.
+// What the requests of one session that have not completed count, for those who implement the port: each user's apart,
+// towards `Limits::maxOutstandingBytes` and towards what the user may hold in all. Any thread.
 class OutstandingBytes {
  public:
+  class User {
+   public:
+    explicit User(std::shared_ptr<UserAccount> account) : account_(std::move(account)) {}
+    // Whether there was room; then it counts until it is given back.
+    [[nodiscard]] bool take(size_t bytes);
+    void giveBack(size_t bytes);
+
+   private:
+    friend class OutstandingBytes;
+    const std::shared_ptr<UserAccount> account_;
+    std::atomic<size_t> bytes_{0};
+    User* next_ = nullptr;
+  };
+
+  OutstandingBytes() = default;
+  ~OutstandingBytes();
+  OutstandingBytes(const OutstandingBytes&) = delete;
+  OutstandingBytes& operator=(const OutstandingBytes&) = delete;
+  // The same one each time; it lives as long as this. Mostly there is one: most sessions serve one client.
+  [[nodiscard]] User& user(const std::shared_ptr<UserAccount>& account);
   // Header lines, body, and what keeping any request costs. One counts at most half of the limit, so that a large
   // upload, which has a limit of its own, neither fails for its size nor shuts out what is posted meanwhile.
   [[nodiscard]] static size_t of(const URLRequest& request);
-  // Whether there was room; then it counts until it is given back.
-  [[nodiscard]] bool take(size_t bytes);
-  void giveBack(size_t bytes) { bytes_.fetch_sub(bytes, std::memory_order_relaxed); }
 
  private:
-  std::atomic<size_t> bytes_{0};
+  std::atomic<User*> first_{nullptr};
 };
 
 // A handle to a request that was started; dropping it changes nothing.
@@ -86,8 +106,9 @@ class URLTask {
 class URLSession {
  public:
   virtual ~URLSession() = default;
-  // A request that would make the session's outstanding ones count more than `Limits::maxOutstandingBytes` fails at
-  // once with kURLErrorOutstandingTooMuch, and those before it go on.
+  // A request that would make what its user has outstanding in this session count more than
+  // `Limits::maxOutstandingBytes`, or more than its user has room for, fails at once with kURLErrorOutstandingTooMuch;
+  // those before it, and other users', go on.
   virtual std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) = 0;
   // Requests already started still complete and call their completions; later ones fail with kURLErrorCancelled.
   virtual void finishTasksAndInvalidate() = 0;

@@ -7,7 +7,9 @@
 #include "platform/Counters.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Keys.h"
+#include "platform/Limits.h"
 #include "platform/Log.h"
+#include "platform/ObjectSize.h"
 #include "platform/Platform.h"
 #include "platform/System.h"
 #include "platform/UserDefaults.h"
@@ -49,7 +51,9 @@ ReportingdSession::ReportingdSession(ReportingdSessionDelegate& delegate,
     : class_(sessionClass),
       _sessionDelegate(delegate),
       peerUser_(connection->peerUser()),
-      _connection(std::move(connection)) {
+      userAccount_(connection->userAccount()),
+      _connection(std::move(connection)),
+      information_(userAccount_, Share::bytes) {
   log().debug("initWithSessionDelegate: ReportingdSession initWithSessionDelegate:%s",
               delegate.description().c_str());
   class_.deviceIdentity().deviceUniqueIDCString(_deviceid.data(), kDeviceIDSize);
@@ -115,9 +119,24 @@ void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dic
   takeOverIdentity(sessionInfo);
   _frameworks = std::move(frameworksToCheck);
   _userInfo = std::move(userInfo);
+  countInformation();
   std::optional<MonitorLock> lock;
   if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
   setHasAggregator(hasAggregationBlock);
+}
+
+// Little of it counts with the connection. A client whose user has no room for it goes.
+void ReportingdSession::countInformation() {
+  size_t bytes = roughSize(_frameworks);
+  if (_sessionInfo) bytes += roughSize(*_sessionInfo);
+  if (_userInfo) bytes += roughSize(*_userInfo);
+  if (_digestKey) bytes += _digestKey->size();
+  if (information_.set(bytes > Limits::freeBytes ? bytes : 0)) return;
+  information_.setAnyway(bytes);
+  if (platform().counters.addAndMayLog(Reason::userBytesExceeded, platform().clock.monotonic()))
+    log().error("setSessionInfo: User %u holds too many bytes for the information of session %u", peerUser_,
+                _sessionID);
+  if (_connection) _connection->invalidate();
 }
 
 void ReportingdSession::startConfigWithCompletionHandler(StatesReply reply) {
@@ -142,6 +161,7 @@ void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
                           .createBackends(storebag, _sessionInfo, _userInfo, _deviceid.data())
                           .value_or(Backends());
   for (const auto& [key, backend] : backends) {
+    backend->setUserAccount(userAccount_);
     backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
     backend->setCombinedSessionIDString(_sessionIDString);
   }
@@ -204,6 +224,7 @@ void ReportingdSession::receivedUserInfo(const std::optional<Dictionary>& userIn
     return;
   }
   _userInfo = userInfo;
+  countInformation();
   updateUserInfoForBackends();
   if (!changed) return;
   log().debug("receivedUserInfo: Received new user info for session %u", _sessionID);
@@ -223,6 +244,7 @@ void ReportingdSession::updateUserInfoForBackends() {
 // with the algorithm 0, and servers that expect that would refuse digests of another.
 void ReportingdSession::setDigestKey(Data key, int32_t algorithm) {
   _digestKey = std::move(key);
+  countInformation();
   KYTReportingBackend* backend = _backends.find(kKYTReportingBackendQRS);
   if (backend == nullptr) return;
   backend->setDigestKey(_digestKey);
@@ -283,6 +305,7 @@ void ReportingdSession::dealloc() {
   _digestKey.reset();
   // Requests that were started complete all the same.
   _connectivityHelper.reset();
+  information_.clear();
 }
 
 }  // namespace kyt

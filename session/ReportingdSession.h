@@ -26,6 +26,7 @@
 #include "config/DeviceIdentity.h"
 #include "platform/Clock.h"
 #include "platform/Counters.h"
+#include "platform/UserBudget.h"
 #include "platform/Value.h"
 #include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/Listener.h"
@@ -119,6 +120,7 @@ class ReportingdSession final : public ClientSessionInterface,
   // Lifecycle and configuration.
   void takeOverIdentity(const Dictionary& sessionInfo);
   void figuresMayHaveChanged();
+  void countInformation();
   void createBackendsWithStorebag(const Dictionary& storebag);
   void updateSessionWithDefaultSessionInfo();
   void sendStartMessage();
@@ -159,6 +161,7 @@ class ReportingdSession final : public ClientSessionInterface,
   String _sessionIDString;  // base64 of a random UUID
   std::array<char, kDeviceIDSize> _deviceid{};
   uint32_t peerUser_;
+  std::shared_ptr<UserAccount> userAccount_;
 
   // Written on the connection's queue while holding the monitor. The first three without it by a session that never
   // was in a hierarchy: nobody else looks at them.
@@ -185,6 +188,7 @@ class ReportingdSession final : public ClientSessionInterface,
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()
   std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
+  Charge information_;           // for what the client said about itself
   bool wasInHierarchy_ = false;  // a session that drops its token stays where it is registered
   bool ended_ = false;
 };

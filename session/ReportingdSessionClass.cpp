@@ -51,7 +51,8 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
                                                         const std::optional<Dictionary>& userInfo,
                                                         const std::optional<Dictionary>& storebag,
                                                         uint16_t category, uint16_t type,
-                                                        const std::optional<Dictionary>& payload) {
+                                                        const std::optional<Dictionary>& payload,
+                                                        const std::shared_ptr<UserAccount>& account) {
   Log& log = platform().log;
   const Value* sessionID = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoSessionID) : nullptr;
   log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %ld",
@@ -77,6 +78,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
   const std::shared_ptr<ReportingSessionConnectivityHelper> helper = singleMessageHelper();
   const TimeValue timestamp = platform().clock.timeOfDay();
   for (const auto& [key, backend] : *backends) {
+    backend->setUserAccount(account);
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
     if (!backend->isWhitelistedEvent(category)) {

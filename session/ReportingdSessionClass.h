@@ -20,6 +20,7 @@ class BackendFactory;
 class KYTReportingBackend;
 class MessageLog;
 class ReportingSessionConnectivityHelper;
+class UserAccount;
 
 class ReportingdSessionClass {
  public:
@@ -35,11 +36,12 @@ class ReportingdSessionClass {
   [[nodiscard]] Mutex& lock() RETURN_CAPABILITY(lock_) { return lock_; }
 
   // Sends one event without a configured session: builds back ends for it alone and discards them afterwards.
-  // Runs on the caller's queue.
+  // Runs on the caller's queue. What it takes counts towards `account`; null: towards nobody's.
   void sendMessageWithSessionInfo(const std::optional<Dictionary>& sessionInfo,
                                   const std::optional<Dictionary>& userInfo,
                                   const std::optional<Dictionary>& storebag, uint16_t category, uint16_t type,
-                                  const std::optional<Dictionary>& payload);
+                                  const std::optional<Dictionary>& payload,
+                                  const std::shared_ptr<UserAccount>& account = nullptr);
 
   // Made at first use; shared by all single messages.
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> singleMessageHelper();

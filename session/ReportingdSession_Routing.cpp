@@ -189,7 +189,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
     if (reply) reply("storebag not available");
     return;
   }
-  class_.sendMessageWithSessionInfo(sessionInfo, userInfo, storebag, category, type, payload);
+  class_.sendMessageWithSessionInfo(sessionInfo, userInfo, storebag, category, type, payload, userAccount_);
   if (reply) reply("finished");
 }
 

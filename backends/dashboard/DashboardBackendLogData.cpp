@@ -25,6 +25,7 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.headers = {{"Content-Type", "application/octet-stream"}};
   request.body = std::move(*body);
   request.isAwaited = true;
+  request.account = userAccount_;
   const auto poster = connectivityDelegate();
   // Deliberately a success: the session is ending, and its client is not told that something is wrong.
   if (poster == nullptr) {

@@ -55,6 +55,7 @@ HTTPSPostBackend::HTTPSPostBackend(Configuration& configuration, String name, Di
 HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
+  giveBackToUser(batchedBytes_);
   if (!batchedEvents_) return;
   platform_.counters.add(Reason::batchDiscarded, batchedEvents_->size());
   tellDiscarded(batchedEvents_->size(),

@@ -133,6 +133,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes);
   void countDroppedByLimit() const;
   void writeSessionIDOnQueue();
+  [[nodiscard]] bool takeFromUser(uint64_t bytes) const;
+  void giveBackToUser(uint64_t bytes) const;
+  void countDroppedByUser() const;
   [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records, uint64_t& bytes);
   [[nodiscard]] bool admits(const Dictionary& record) const;
   [[nodiscard]] Array recordsToPost(Array batch, uint64_t bytes) const;
@@ -179,7 +182,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   std::optional<Array> batchedEvents_;
   std::vector<std::pair<int32_t, int32_t>> eventMethodCounts_;  // method, records of it in the batch; sorted
   bool batchHasOldSessionID_ = false;  // written into the records when somebody reads them
-  uint64_t batchedBytes_ = 0;          // estimate of what the batch holds, for the limit alone
+  uint64_t batchedBytes_ = 0;          // estimate of what the batch holds; its user's account has it
   // The size that the health report shows, of so many records at the beginning of the batch.
   mutable size_t sizedRecords_ = 0;
   mutable uint64_t sizeOfRecords_ = 0;

@@ -11,36 +11,11 @@
 #include "platform/ObjectSize.h"
 #include "platform/Platform.h"
 #include "platform/SerialQueue.h"
+#include "platform/UserBudget.h"
 
 namespace kyt {
 
 namespace {
-
-constexpr size_t kBlockOverhead = 32;  // header of a block, and the allocator's
-
-// What a record holds, roughly: for the limit of the batch, where the health report's estimate would cost a
-// query of the allocator for each block of each event.
-size_t heldBytes(const Dictionary& dictionary);
-
-size_t heldBytes(const Value& value) {
-  if (value.block() == nullptr) return 0;  // all but long texts, data and containers
-  if (const String* text = value.string()) return kBlockOverhead + text->size();
-  if (const Data* data = value.data()) return kBlockOverhead + data->size();
-  if (const Dictionary* dictionary = value.dictionary()) return heldBytes(*dictionary);
-  const Array& array = *value.array();
-  size_t bytes = kBlockOverhead + array.size() * sizeof(Value);
-  for (const Value& element : array) bytes += heldBytes(element);
-  return bytes;
-}
-
-size_t heldBytes(const Dictionary& dictionary) {
-  size_t bytes = kBlockOverhead + dictionary.size() * sizeof(DictionaryEntry);
-  for (const DictionaryEntry& entry : dictionary) {
-    if (entry.key.block() != nullptr) bytes += kBlockOverhead + entry.key.size();
-    if (entry.value.block() != nullptr) bytes += heldBytes(entry.value);
-  }
-  return bytes;
-}
 
 int32_t methodOf(const Dictionary& record) {
   const Value* method = record.find("_method");
@@ -94,9 +69,10 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
     count = 0;
     batched = stateQueue().sync([this] { return batchedBytes_; });  // a flush may have kept the batch
   }
-  const uint64_t bytes = heldBytes(record);
-  if (batched + bytes > platform_.limits.maxBatchBytes) {
-    countDroppedByLimit();
+  const uint64_t bytes = roughSize(record);
+  const bool fits = batched + bytes <= platform_.limits.maxBatchBytes;
+  if (!fits || !takeFromUser(bytes)) {
+    fits ? countDroppedByUser() : countDroppedByLimit();
     // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
     stateQueue().async([this] {
       if (batchedEvents_ && batchedEvents_->empty()) batchedEvents_.reset();
@@ -114,6 +90,21 @@ void HTTPSPostBackend::countDroppedByLimit() const {
   platform_.log.error(
       "HTTPSPostBackend(batchEvent): the batch of backend %s is full (%llu bytes), dropping events",
       name_.c_str(), static_cast<unsigned long long>(platform_.limits.maxBatchBytes));
+}
+
+bool HTTPSPostBackend::takeFromUser(uint64_t bytes) const {
+  return userAccount_ == nullptr || userAccount_->take(Share::bytes, bytes, kLeftForMessages);
+}
+
+void HTTPSPostBackend::giveBackToUser(uint64_t bytes) const {
+  if (userAccount_ != nullptr) userAccount_->giveBack(Share::bytes, bytes);
+}
+
+void HTTPSPostBackend::countDroppedByUser() const {
+  if (!platform_.counters.addAndMayLog(Reason::userBatchesFull, platform_.clock.monotonic())) return;
+  platform_.log.error("HTTPSPostBackend(batchEvent): user %u holds %llu bytes, dropping events of backend %s",
+                      userAccount_->user(),
+                      static_cast<unsigned long long>(userAccount_->holds(Share::bytes)), name_.c_str());
 }
 
 HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records, uint64_t& bytes) {
@@ -142,6 +133,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   uint64_t bytes = 0;
   switch (stateQueue().sync([&] { return takeBatchOnQueue(batch, bytes); })) {
     case BatchTaking::discarded:
+      giveBackToUser(bytes);
       platform_.counters.add(Reason::batchDiscarded, batch.size());
       if (requireUserInfo_ && !hasUserInfo())
         tellDiscarded(batch.size(), "user information was promised and is missing");
@@ -161,6 +153,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   std::optional<std::string> json;
   const size_t events = records.size();
   if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty);
+  giveBackToUser(bytes);  // the request counts by itself
   if (!json) {
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
     return {};
@@ -201,7 +194,7 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   if (userInfoDict_) userInfo = *userInfoDict_;
   filterEvent(userInfo);
   const uint64_t limit = platform_.limits.maxBatchBytes;
-  const bool mayOutgrow = bytes + batch.size() * heldBytes(userInfo) > limit;
+  const bool mayOutgrow = bytes + batch.size() * roughSize(userInfo) > limit;
   uint64_t kept = 0;
   Array records;
   records.reserve(batch.size());
@@ -213,7 +206,7 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
       continue;
     }
     record->merge(userInfo);
-    if (mayOutgrow && (kept += heldBytes(*record)) > limit) {
+    if (mayOutgrow && (kept += roughSize(*record)) > limit) {
       countDroppedByLimit();
       continue;
     }

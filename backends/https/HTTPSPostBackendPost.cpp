@@ -201,6 +201,7 @@ URLRequest HTTPSPostBackend::newRequest(std::string url, std::string json, std::
   if (digestKey_ && digestAlgorithm_ == kDigestAlgorithmHMACSHA1) header("X-KYT-DIGEST", digestOfBody(*body));
   request.body = std::move(*body);
   request.allowsCellularAccess = !shouldUseWiFiOnly_;
+  request.account = userAccount_;
   return request;
 }
 

@@ -38,7 +38,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     Responder responder;
     size_t index = 0;
     const size_t charge = OutstandingBytes::of(entry.request);
-    const bool tooMuch = !refused && !entry.outstanding->take(charge);
+    const bool tooMuch = !refused && !entry.outstanding->user(entry.request.account).take(charge);
     if (!refused && !tooMuch) entry.charge = charge;
     {
       std::lock_guard lock(mutex_);
@@ -69,7 +69,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
       Entry& entry = *entries_.at(index);
       if (!entry.open) return false;
       entry.open = false;
-      entry.outstanding->giveBack(entry.charge);
+      entry.outstanding->user(entry.request.account).giveBack(entry.charge);
       --open_;
       ++(reply.error ? figures_.failed : figures_.completed);
       completion = std::move(entry.completion);

@@ -2,6 +2,8 @@
 
 #include <utility>
 
+#include "platform/Limits.h"
+
 namespace kyt {
 namespace {
 
@@ -19,8 +21,11 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
     if (++lastSerial_ == 0) ++lastSerial_;
     MessageWriter writer(queue);
     if (!build(writer, lastSerial_)) return Sent::refused;
-    if (kind == Kind::droppable && waitingBytes() > maxQueuedBytes_) {
+    const bool droppable = kind == Kind::droppable;
+    if (droppable) countWaiting();
+    if (droppable && (waitingBytes() > maxQueuedBytes_ || fillsItsUsersShare())) {
       queue.resize(before);
+      countWaiting();
       return Sent::queueFull;
     }
     event = queued(kind);
@@ -57,16 +62,29 @@ ConnectionOutput::Event ConnectionOutput::queued(Kind kind) {
   const bool mayHold = held_ && waitingBytes() < kMostHeldBytes && waitingBytes() <= maxQueuedBytes_;
   if (!waiting_ && !mayHold) event = flush();
   const size_t left = waitingBytes();
-  if (event == Event::broken || left <= maxQueuedBytes_) return event;
-  if (left > 2 * maxQueuedBytes_ && kind != Kind::vital) {
-    dead_ = true;
-    pending_ = std::string();
-    written_ = 0;
+  countWaiting();
+  const bool mayEnd = event != Event::broken && kind != Kind::vital;
+  if (mayEnd && (left > 2 * maxQueuedBytes_ || fillsItsUsersShare())) {
+    discard();
     return Event::overflowed;
   }
+  if (event == Event::broken || left <= maxQueuedBytes_) return event;
   if (paused_) return event;
   paused_ = true;
   return event == Event::needsRoom ? Event::pausedAndNeedsRoom : Event::paused;
+}
+
+// While the socket takes what is written, little waits, and not for long: that is counted with the connection.
+void ConnectionOutput::countWaiting() {
+  charge_.setAnyway(waiting_ ? waitingBytes() + Limits::socketBytes : 0);
+}
+
+// Nothing is sent any more.
+void ConnectionOutput::discard() {
+  dead_ = true;
+  pending_ = std::string();
+  written_ = 0;
+  charge_.clear();
 }
 
 ConnectionOutput::Event ConnectionOutput::flush() {
@@ -80,12 +98,11 @@ ConnectionOutput::Event ConnectionOutput::flush() {
       const bool mayGoOn = paused_ && pending_.size() - written_ <= maxQueuedBytes_ / 2;
       if (mayGoOn) paused_ = false;
       waiting_ = true;
+      countWaiting();
       return mayGoOn ? Event::drainedAndNeedsRoom : Event::needsRoom;
     }
     if (result.status != StreamStatus::ok) {
-      dead_ = true;
-      pending_ = std::string();
-      written_ = 0;
+      discard();
       return Event::broken;
     }
     written_ += result.bytes;
@@ -94,6 +111,7 @@ ConnectionOutput::Event ConnectionOutput::flush() {
   written_ = 0;
   const bool tellDrained = paused_.exchange(false) || (finishing_ && waiting_);
   waiting_ = false;
+  countWaiting();
   return tellDrained ? Event::drained : Event::none;
 }
 
@@ -171,8 +189,7 @@ bool ConnectionOutput::finish() {
 void ConnectionOutput::close() {
   MutexLock lock(mutex_);
   stream_ = nullptr;
-  pending_ = std::string();
-  written_ = 0;
+  discard();
 }
 
 }  // namespace kyt

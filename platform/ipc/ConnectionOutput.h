@@ -3,8 +3,9 @@
 //
 // A turn of the connection gathers its replies (hold() … release()), so that they leave in one write; they
 // leave earlier when the turn is about to block. What waits is limited: past `maxQueuedBytes` the connection
-// stops reading from its client until half of it is gone; past twice that it ends. Callable from any thread;
-// never blocks.
+// stops reading from its client until half of it is gone; past twice that it ends. It also ends when its client does not
+// read while all that is kept for the clients of its user is more than their share. Callable from any thread; never
+// blocks.
 #pragma once
 
 #include <atomic>
@@ -14,6 +15,7 @@
 
 #include "platform/Function.h"
 #include "platform/Mutex.h"
+#include "platform/UserBudget.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/ipc/Stream.h"
 
@@ -33,8 +35,13 @@ class ConnectionOutput {
   };
 
   // `stream` is used until close().
-  ConnectionOutput(Stream& stream, std::weak_ptr<Observer> observer, uint64_t maxQueuedBytes)
-      : stream_(&stream), observer_(std::move(observer)), maxQueuedBytes_(maxQueuedBytes) {}
+  ConnectionOutput(Stream& stream, std::weak_ptr<Observer> observer, uint64_t maxQueuedBytes,
+                   const std::shared_ptr<UserAccount>& account)
+      : stream_(&stream),
+        observer_(std::move(observer)),
+        maxQueuedBytes_(maxQueuedBytes),
+        account_(account),
+        charge_(account, Share::bytes) {}
 
   enum class Kind : uint8_t {
     ordinary,
@@ -82,12 +89,19 @@ class ConnectionOutput {
   [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) {
     return pending_.size() - written_ + early_.size();
   }
+  void countWaiting() REQUIRES(mutex_);
+  [[nodiscard]] bool fillsItsUsersShare() const REQUIRES(mutex_) {
+    return waiting_ && account_ != nullptr && account_->isOver(Share::bytes);
+  }
+  void discard() REQUIRES(mutex_);
   void tell(Event event);
 
   mutable Mutex mutex_;
   Stream* stream_ GUARDED_BY(mutex_);
   const std::weak_ptr<Observer> observer_;
   const uint64_t maxQueuedBytes_;
+  const std::shared_ptr<UserAccount> account_;
+  Charge charge_ GUARDED_BY(mutex_);  // for what waits while the socket is full, its own buffer included
   std::string pending_ GUARDED_BY(mutex_);
   std::string early_ GUARDED_BY(mutex_);  // messages that wait for the handshake's end
   bool open_ GUARDED_BY(mutex_) = false;

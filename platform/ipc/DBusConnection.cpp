@@ -12,20 +12,24 @@
 namespace kyt {
 
 DBusConnection::DBusConnection(std::shared_ptr<ServerContext> context, std::unique_ptr<Stream> stream,
-                               PeerCredentials peer, uint64_t number)
+                               PeerCredentials peer, std::shared_ptr<UserAccount> account, uint64_t number)
     : context_(std::move(context)),
       number_(number),
       user_(peer.uid),
       process_(peer.pid),
+      account_(std::move(account)),
       queue_(SerialQueue::create("kyt.connection", context_->services.executor, uint64_t{peer.uid} + 1)),
       stream_(std::move(stream)),
-      peer_(std::make_unique<PeerCredentials>(std::move(peer))) {}
+      peer_(std::make_unique<PeerCredentials>(std::move(peer))),
+      keptCharge_(account_, Share::bytes),
+      descriptorsCharge_(account_, Share::descriptors) {}
 
 DBusConnection::~DBusConnection() = default;
 
 void DBusConnection::offer(Listener& listener, ListenerDelegate& delegate) {
   const std::shared_ptr<ConnectionOutput::Observer> observer(shared_from_this(), this);
-  output_ = std::make_shared<ConnectionOutput>(*stream_, observer, context_->services.limits.maxQueuedBytes);
+  output_ = std::make_shared<ConnectionOutput>(*stream_, observer, context_->services.limits.maxQueuedBytes,
+                                               account_);
   queue_->async([self = shared_from_this(), &listener, &delegate] {
     if (self->ended_ || self->closed()) return;
     const bool accepted = delegate.listenerShouldAcceptNewConnection(listener, self);
@@ -103,7 +107,7 @@ void DBusConnection::abandon() {
   }
   watch.cancel();
   output_->close();
-  context_->remove(number_, user_);
+  context_->remove(number_, *account_);
 }
 
 // Reports the one problem that ends the connection.
@@ -118,6 +122,7 @@ void DBusConnection::end(bool broken, bool waitForOutput) {
   if (closed() || std::exchange(ended_, true)) return;
   invalidating_ = true;
   handshakeTimer_.cancel();
+  messageTimer_.cancel();
   if (handshake_ && finishing_) output_->sendHandshake(kServerEnds);
   if (started_) {
     Task interruption = std::move(interruptionHandler_), invalidation = std::move(invalidationHandler_);
@@ -129,7 +134,9 @@ void DBusConnection::end(bool broken, bool waitForOutput) {
   exportedObject_.reset();
   handshake_.reset();
   descriptors_.clear();
+  descriptorsCharge_.clear();
   kept_ = std::string();
+  keptCharge_.clear();
   // What the turn's deferred work still answers leaves with the rest.
   if (Turn* turn = Turn::current()) turn->runDeferred();
   if (output_->finish() || !waitForOutput) closeStream();
@@ -145,7 +152,7 @@ void DBusConnection::closeStream() {
   watch.cancel();
   output_->close();
   stream_.reset();
-  context_->remove(number_, user_);
+  context_->remove(number_, *account_);
 }
 
 void DBusConnection::scheduleTurn() {

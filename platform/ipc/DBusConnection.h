@@ -23,6 +23,7 @@
 #include "platform/Reactor.h"
 #include "platform/SerialQueue.h"
 #include "platform/Timer.h"
+#include "platform/UserBudget.h"
 #include "platform/ipc/ConnectionOutput.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/Listener.h"
@@ -37,7 +38,7 @@ class DBusConnection final : public Connection,
                              public std::enable_shared_from_this<DBusConnection> {
  public:
   DBusConnection(std::shared_ptr<ServerContext> context, std::unique_ptr<Stream> stream, PeerCredentials peer,
-                 uint64_t number);
+                 std::shared_ptr<UserAccount> account, uint64_t number);
   ~DBusConnection() override;
 
   // Asks the delegate, on the queue; starts, or closes at once.
@@ -48,6 +49,7 @@ class DBusConnection final : public Connection,
   [[nodiscard]] Value entitlementValue(std::string_view key) override;
   [[nodiscard]] std::string description() const override;
   [[nodiscard]] uint32_t peerUser() const override { return user_; }
+  [[nodiscard]] std::shared_ptr<UserAccount> userAccount() const override { return account_; }
   void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
   void setInterruptionHandler(Task handler) override { interruptionHandler_ = std::move(handler); }
   void setInvalidationHandler(Task handler) override { invalidationHandler_ = std::move(handler); }
@@ -82,7 +84,10 @@ class DBusConnection final : public Connection,
   Step handleMessage(std::span<const std::byte> bytes, size_t& consumed, HeaderMemory& header);
   Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken);
   [[nodiscard]] bool mustPause() const;
-  void keepRest(std::span<const std::byte> rest);
+  Step keepRest(std::span<const std::byte> rest);
+  Step tooManyBytes();
+  void watchBegunMessage();
+  void messageTookTooLong();
   Step breakOff(Reason reason, const char* problem);
 
   void countRefusal();
@@ -110,6 +115,7 @@ class DBusConnection final : public Connection,
   const uint64_t number_;
   const uint32_t user_;
   const int32_t process_;
+  const std::shared_ptr<UserAccount> account_;
   const std::shared_ptr<SerialQueue> queue_;
 
   // Synchronises itself.
@@ -130,6 +136,10 @@ class DBusConnection final : public Connection,
   std::string kept_;   // the beginning of a message, or messages that the last turn left
   size_t needed_ = 0;  // how much kept_ must hold before it is worth looking at
   std::vector<Descriptor> descriptors_;
+  Charge keptCharge_, descriptorsCharge_;  // for these
+  TimerHandle messageTimer_;               // while a message is unfinished, and a little longer
+  bool messageTimed_ = false;
+  uint64_t messages_ = 0, timedMessages_ = 0;  // handled by now, and when the timer was set
   bool descriptorsAgreed_ = false;
   bool refused_ = false;  // what was asked for was not granted
   bool resumed_ = false, started_ = false, ended_ = false;

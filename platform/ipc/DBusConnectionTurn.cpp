@@ -55,6 +55,29 @@ void DBusConnection::turn() {
   }
   if (step == Step::more) scheduleTurn();
   if (step == Step::drained) armRead();
+  if (step == Step::drained || step == Step::paused) watchBegunMessage();
+}
+
+// One timer at a time looks whether the message that was unfinished when it was set still is. So an unfinished one ends
+// its connection after once to twice the time, and a client that sends without a pause costs a timer now and then.
+void DBusConnection::watchBegunMessage() {
+  if (messageTimed_ || ended_ || kept_.empty() || handshake_) return;
+  messageTimed_ = true;
+  timedMessages_ = messages_;
+  const auto patience =
+      std::chrono::duration_cast<Duration>(std::chrono::duration<double>(Limits::messageSeconds));
+  messageTimer_ = context_->services.timers.after(patience, queue_, [weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->messageTookTooLong();
+  });
+}
+
+void DBusConnection::messageTookTooLong() {
+  messageTimed_ = false;
+  if (ended_ || closed()) return;
+  // A client that is not read from cannot finish its message.
+  if (timedMessages_ != messages_ || kept_.empty() || mustPause()) return watchBegunMessage();
+  breakOff(Reason::messageTimedOut, "the rest of a message did not come");
+  end(true, false);
 }
 
 DBusConnection::Step DBusConnection::runSteps(Progress& progress) {
@@ -89,6 +112,7 @@ DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress&
       kept_.clear();
       bytes = buffer.first(before + read);
     } else {
+      if (!keptCharge_.set(kept_.size() + read)) return tooManyBytes();
       kept_.append(reinterpret_cast<const char*>(buffer.data()), read);
       if (kept_.size() < needed_) return after;
       large = std::exchange(kept_, std::string());
@@ -98,8 +122,9 @@ DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress&
   size_t consumed = 0;
   const unsigned before = progress.calls;
   const Step handled = handleBytes(bytes, consumed, progress);
-  keepRest(bytes.subspan(consumed));
+  const Step kept = keepRest(bytes.subspan(consumed));
   if (handled != Step::more) return handled;
+  if (kept != Step::more) return kept;
   const bool leftWhole = !kept_.empty() && kept_.size() >= needed_;
   // A client that sent many calls has mostly sent more meanwhile: looking costs less than being told.
   const bool mayHaveMore = after == Step::drained && progress.calls - before >= kManyCalls;
@@ -119,6 +144,8 @@ DBusConnection::Step DBusConnection::readMore(std::span<std::byte> buffer, size_
   // During the handshake they may belong to a message behind it, of which this read has the beginning.
   if (descriptorsAgreed_ || handshake_) {
     for (Descriptor& descriptor : received) descriptors_.push_back(std::move(descriptor));
+    if (!descriptorsCharge_.set(descriptors_.size()))
+      return breakOff(Reason::tooManyDescriptorsOfUser, "its user's clients hold too many descriptors");
   }
   switch (result.status) {
     case StreamStatus::ok:
@@ -136,15 +163,25 @@ DBusConnection::Step DBusConnection::readMore(std::span<std::byte> buffer, size_
   return Step::broken;
 }
 
+DBusConnection::Step DBusConnection::tooManyBytes() {
+  return breakOff(Reason::userBytesExceeded, "its user's clients hold too many bytes");
+}
+
 // Keeps what was not handled, in a block of exactly its size, and closes descriptors that no message claimed.
-void DBusConnection::keepRest(std::span<const std::byte> rest) {
+DBusConnection::Step DBusConnection::keepRest(std::span<const std::byte> rest) {
   if (rest.empty()) {
     kept_ = std::string();
+    keptCharge_.clear();
     needed_ = 0;
-    descriptors_.clear();
-    return;
+    if (!descriptors_.empty()) {
+      descriptors_.clear();
+      descriptorsCharge_.clear();
+    }
+    return Step::more;
   }
+  if (!keptCharge_.set(rest.size() > Limits::freeBytes ? rest.size() : 0)) return tooManyBytes();
   kept_ = std::string(reinterpret_cast<const char*>(rest.data()), rest.size());
+  return Step::more;
 }
 
 DBusConnection::Step DBusConnection::handleBytes(std::span<const std::byte> bytes, size_t& consumed,
@@ -157,6 +194,7 @@ DBusConnection::Step DBusConnection::handleBytes(std::span<const std::byte> byte
     if (step != Step::more) return step;
     if (taken == 0) break;  // not a whole message
     needed_ = 0;
+    ++messages_;
     ++progress.calls;
     if (invalidating_) return Step::stopped;
     if (mustPause()) return Step::paused;
@@ -179,7 +217,10 @@ DBusConnection::Step DBusConnection::handleHandshake(std::span<const std::byte> 
       return breakOff(Reason::handshakeFailed, handshake_->problem());
     case ServerHandshake::Status::done:
       descriptorsAgreed_ = handshake_->descriptorsAgreed();
-      if (!descriptorsAgreed_) descriptors_.clear();
+      if (!descriptorsAgreed_) {
+        descriptors_.clear();
+        descriptorsCharge_.clear();
+      }
       handshake_.reset();
       handshakeTimer_.cancel();
       output_->open();
@@ -230,6 +271,7 @@ DBusConnection::Step DBusConnection::takeDescriptors(const Message& message, std
   const auto end = descriptors_.begin() + message.unixFds;
   taken.assign(std::make_move_iterator(descriptors_.begin()), std::make_move_iterator(end));
   descriptors_.erase(descriptors_.begin(), end);
+  descriptorsCharge_.setAnyway(descriptors_.size());  // less than before
   return Step::more;
 }
 

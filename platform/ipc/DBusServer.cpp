@@ -7,6 +7,7 @@
 #include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/SerialQueue.h"
+#include "platform/UserBudget.h"
 #include "platform/ipc/DBusConnection.h"
 
 namespace kyt {
@@ -141,17 +142,11 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
   void take(std::unique_ptr<Stream> stream) {
     PeerCredentials peer = stream->peer();
     const uint32_t user = peer.uid;
-    switch (context_->admit(user)) {
-      case ServerContext::Admission::admitted:
-        break;
-      case ServerContext::Admission::tooMany:
-        return refuse(std::move(stream), Reason::tooManyConnections, user);
-      case ServerContext::Admission::tooManyOfUser:
-        return refuse(std::move(stream), Reason::tooManyConnectionsOfUser, user);
-    }
+    std::shared_ptr<UserAccount> account = context_->services.budget.account(user);
+    if (const auto reason = context_->admit(*account)) return refuse(std::move(stream), *reason, user);
     const uint64_t number = ++lastNumber_;
-    const auto connection =
-        std::make_shared<DBusConnection>(context_, std::move(stream), std::move(peer), number);
+    const auto connection = std::make_shared<DBusConnection>(context_, std::move(stream), std::move(peer),
+                                                             std::move(account), number);
     context_->enlist(number, connection);
     connection->offer(listener_, *delegate_);
   }

@@ -14,6 +14,7 @@
 namespace kyt {
 
 class SerialQueue;
+class UserAccount;
 
 class Connection {
  public:
@@ -23,6 +24,8 @@ class Connection {
   // One line for logs: what identifies the peer (process, user, executable) and this connection.
   [[nodiscard]] virtual std::string description() const = 0;
   [[nodiscard]] virtual uint32_t peerUser() const = 0;
+  // Where what is kept on the client's behalf is counted; null: nowhere.
+  [[nodiscard]] virtual std::shared_ptr<UserAccount> userAccount() const { return nullptr; }
   // Called before resume(). The connection keeps the object until it is invalidated.
   virtual void setExportedObject(std::shared_ptr<ClientSessionInterface> object) = 0;
   // Run on the connection's queue. An interruption comes before an invalidation when the stream broke in the

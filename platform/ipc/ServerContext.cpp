@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/Limits.h"
+#include "platform/UserBudget.h"
 #include "platform/ipc/DBusConnection.h"
 
 namespace kyt {
@@ -29,14 +30,21 @@ ServerContext::ServerContext(DBusServerServices given)
       dispatcher(services.counters,
                  {.machineId = services.machineId, .introspection = clientSessionIntrospection()}) {}
 
-ServerContext::Admission ServerContext::admit(uint32_t user) {
+std::optional<Reason> ServerContext::admit(UserAccount& user) {
   MutexLock lock(mutex_);
-  if (count_ >= services.limits.maxConnections) return Admission::tooMany;
-  size_t& ofUser = countOfUser_[user];
-  if (ofUser >= services.limits.maxConnectionsPerUser) return Admission::tooManyOfUser;
-  ++ofUser;
+  if (count_ >= services.limits.maxConnections) return Reason::tooManyConnections;
+  if (!user.take(Share::connections, 1)) return Reason::tooManyConnectionsOfUser;
+  if (!user.take(Share::descriptors, 1)) {
+    user.giveBack(Share::connections, 1);
+    return Reason::tooManyDescriptorsOfUser;
+  }
+  if (!user.take(Share::bytes, Limits::connectionBytes)) {
+    user.giveBack(Share::connections, 1);
+    user.giveBack(Share::descriptors, 1);
+    return Reason::userBytesExceeded;
+  }
   ++count_;
-  return Admission::admitted;
+  return std::nullopt;
 }
 
 void ServerContext::enlist(uint64_t number, std::shared_ptr<DBusConnection> connection) {
@@ -44,7 +52,7 @@ void ServerContext::enlist(uint64_t number, std::shared_ptr<DBusConnection> conn
   connections_.emplace(number, std::move(connection));
 }
 
-void ServerContext::remove(uint64_t number, uint32_t user) {
+void ServerContext::remove(uint64_t number, UserAccount& user) {
   std::shared_ptr<DBusConnection> connection;  // dropped without the lock
   MutexLock lock(mutex_);
   const auto found = connections_.find(number);
@@ -52,8 +60,9 @@ void ServerContext::remove(uint64_t number, uint32_t user) {
   connection = std::move(found->second);
   connections_.erase(found);
   --count_;
-  const auto ofUser = countOfUser_.find(user);
-  if (--ofUser->second == 0) countOfUser_.erase(ofUser);
+  user.giveBack(Share::connections, 1);
+  user.giveBack(Share::descriptors, 1);
+  user.giveBack(Share::bytes, Limits::connectionBytes);
 }
 
 size_t ServerContext::connectionCount() const {

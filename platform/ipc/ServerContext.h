@@ -4,10 +4,12 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "platform/Counters.h"
 #include "platform/Mutex.h"
 #include "platform/ipc/ClientSessionDispatcher.h"
 
@@ -20,6 +22,8 @@ class Executor;
 class Log;
 class Reactor;
 class TimerService;
+class UserAccount;
+class UserBudget;
 struct Limits;
 
 // Everything outlives the server and its connections.
@@ -32,6 +36,7 @@ struct DBusServerServices {
   Executor& executor;
   Reactor& reactor;
   Entitlements& entitlements;
+  UserBudget& budget;
   std::string machineId;  // 32 hexadecimal digits; also the server's GUID in the handshake
 };
 
@@ -53,11 +58,10 @@ class ServerContext {
  public:
   explicit ServerContext(DBusServerServices services);
 
-  enum class Admission : uint8_t { admitted, tooMany, tooManyOfUser };
-  // Counts a connection of that user, or says which limit it would pass.
-  [[nodiscard]] Admission admit(uint32_t user);
+  // Counts a connection of that user, or says why there is no room for it.
+  [[nodiscard]] std::optional<Reason> admit(UserAccount& user);
   void enlist(uint64_t number, std::shared_ptr<DBusConnection> connection);
-  void remove(uint64_t number, uint32_t user);
+  void remove(uint64_t number, UserAccount& user);
   [[nodiscard]] size_t connectionCount() const;
   [[nodiscard]] std::vector<std::shared_ptr<DBusConnection>> connections() const;
 
@@ -68,7 +72,6 @@ class ServerContext {
  private:
   mutable Mutex mutex_;
   size_t count_ GUARDED_BY(mutex_) = 0;
-  std::unordered_map<uint32_t, size_t> countOfUser_ GUARDED_BY(mutex_);
   std::unordered_map<uint64_t, std::shared_ptr<DBusConnection>> connections_ GUARDED_BY(mutex_);
 };
 

@@ -89,10 +89,10 @@ bool TestDaemon::start() {
   pool_ = std::make_unique<WorkerPool>(WorkerPoolOptions{});
   auto acceptor = UnixSocketAcceptor::bindAt(path_);
   if (!reactor_ || acceptor.index() != 0) return false;
-  server_ =
-      std::make_unique<DBusServer>(DBusServerServices{limits_, counters_, log_, clock_, *reactor_, *pool_,
-                                                      *reactor_, *this, "0123456789abcdef0123456789abcdef"},
-                                   std::move(std::get<0>(acceptor)));
+  server_ = std::make_unique<DBusServer>(
+      DBusServerServices{limits_, counters_, log_, clock_, *reactor_, *pool_, *reactor_, *this, budget_,
+                         "0123456789abcdef0123456789abcdef"},
+      std::move(std::get<0>(acceptor)));
   server_->setDelegate(*this);
   server_->resume();
   return true;

@@ -11,6 +11,7 @@
 #include "platform/Entitlements.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
+#include "platform/UserBudget.h"
 #include "platform/WorkerPool.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/ipc/DBusServer.h"
@@ -76,6 +77,7 @@ class TestDaemon final : public ListenerDelegate, private Entitlements {
   std::atomic<bool> entitled_{true};
   std::optional<Array> states_ = Array{"httppost", "qrs"};
   Limits limits_;
+  UserBudget budget_{UserShares::of(limits_, uint64_t{1} << 30, 65536)};
   Counters counters_;
   MemoryLogSink sink_;
   Log log_{sink_, LogLevel::error};

@@ -42,7 +42,8 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
                     fakes.daemonBundle,
                     fakes.fileExtensions,
                     fakes.pluginBundles,
-                    fakes.powerLog};
+                    fakes.powerLog,
+                    fakes.budget};
   Configuration configuration{platform, test_.deviceIdentity, test_.environment};
   DefaultBackendFactory factory(configuration, backendTable(configuration));
   ReportingdSessionClass sessionClass(configuration, factory, messageLog_);

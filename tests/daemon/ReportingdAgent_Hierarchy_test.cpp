@@ -239,7 +239,7 @@ TEST_F(AgentHierarchy, ConfigurationBringsStatesAndCombinedIDsDown) {
 }
 
 TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
-  test_.limits.maxHierarchyTokensPerUser = 2;
+  test_.budget.shares()[Share::hierarchyTokens] = 2;
   clientWith(sessionInfoAt(0, "A"));
   clientWith(sessionInfoAt(0, "B"));
   const Client refused = clientWith(sessionInfoAt(1, "C", 7));

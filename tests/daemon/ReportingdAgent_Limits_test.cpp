@@ -12,8 +12,8 @@ class AgentLimits : public AgentFixture {
 };
 
 TEST_F(AgentLimits, OfOneUserLeaveAnothersHierarchyWhole) {
-  test_.limits.maxHierarchyTokensPerUser = 2;
-  test_.limits.maxSharedDataBytesPerUser = 2000;
+  test_.budget.shares()[Share::hierarchyTokens] = 2;
+  test_.budget.shares()[Share::sharedDataBytes] = 2000;
   ReportingdAgent agent(test_.configuration, fetcher_, class_, transaction_);
   listener_.setDelegate(agent);
   Client parent = clientWith(sessionInfoAt(0, "T", 1), true, kOther);

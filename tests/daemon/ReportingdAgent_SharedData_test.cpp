@@ -55,7 +55,7 @@ TEST_F(AgentSharedData, ReachesTheBackEndsOfTheWholeHierarchy) {
 }
 
 TEST_F(AgentSharedData, OfOneUserIsLimited) {
-  test_.limits.maxSharedDataBytesPerUser = 2000;
+  test_.budget.shares()[Share::sharedDataBytes] = 2000;
   ReportingdAgent agent(test_.configuration, fetcher_, class_, transaction_);
   listener_.setDelegate(agent);
   const Client a = clientWith(sessionInfoAt(0, "T", 3)),

@@ -4,13 +4,18 @@
 
 #include <string>
 
+#include "platform/Limits.h"
+
 namespace kyt {
 namespace {
 
 constexpr uint32_t kOne = 1, kTwo = 2;
 
 TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
-  SharedDataStore store(10000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_FALSE(store.dictionary("T"));
   store.removeObject("T", "k");
   store.removeToken("T");
@@ -18,13 +23,19 @@ TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
 }
 
 TEST(SharedDataStore, AnEmptyUpdateMakesAnEmptyDictionary) {
-  SharedDataStore store(10000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary(), kOne));
   EXPECT_EQ(store.dictionary("T"), Dictionary());
 }
 
 TEST(SharedDataStore, ChargesAValueToWhoWroteItLast) {
-  SharedDataStore store(10000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
   const uint64_t before = store.bytesOfUser(kOne);
   EXPECT_GE(before, 1000U);
@@ -34,7 +45,10 @@ TEST(SharedDataStore, ChargesAValueToWhoWroteItLast) {
 }
 
 TEST(SharedDataStore, ChargesWhatContainersHold) {
-  SharedDataStore store(100000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 100000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_TRUE(store.update(
       "T", Dictionary{{"k", Array{std::string(100, 'x'), Dictionary{{"n", Data(std::string(200, 'd'))}}}}},
       kOne));
@@ -42,7 +56,10 @@ TEST(SharedDataStore, ChargesWhatContainersHold) {
 }
 
 TEST(SharedDataStore, AUserMayReplaceAValueAtTheLimit) {
-  SharedDataStore store(1500);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 1500;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(900, 'x')}}, kOne));
   EXPECT_FALSE(store.update("T", Dictionary{{"l", std::string(900, 'x')}}, kOne));
   EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(901, 'z')}}, kOne));
@@ -51,21 +68,30 @@ TEST(SharedDataStore, AUserMayReplaceAValueAtTheLimit) {
 }
 
 TEST(SharedDataStore, ARefusedUpdateMakesNoToken) {
-  SharedDataStore store(300);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 300;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_FALSE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
   EXPECT_FALSE(store.dictionary("T"));
   EXPECT_EQ(store.bytesOfUser(kOne), 0U);
 }
 
 TEST(SharedDataStore, ManyEmptyEntriesPassTheLimitToo) {
-  SharedDataStore store(10000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   int accepted = 0;
   while (accepted < 1000 && store.update("T", Dictionary{{std::to_string(accepted), 0}}, kOne)) ++accepted;
   EXPECT_LT(accepted, 100);
 }
 
 TEST(SharedDataStore, WhatIsRemovedIsChargedNoMore) {
-  SharedDataStore store(10000);
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", 1}, {"l", std::string(800, 'x')}}, kOne));
   store.removeObject("T", "l");
   store.removeObject("T", "absent");

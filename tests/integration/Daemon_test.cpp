@@ -234,7 +234,9 @@ TEST_F(Daemon, EndsThousandsOfSessionsWithinTheGrace) {
   TestHTTPServer::Reply reply;
   reply.body = signedBag(bag, propertyLists_);
   server_.setReply(reply);
-  daemon_.addSettings("[limits]\nmax_connections_per_user = 16384\n");
+  daemon_.addSettings(
+      "[limits]\nmax_connections_per_user = 16384\nmax_descriptors_per_user = 16384\n"
+      "max_bytes_per_user = 4294967296\n");
   daemon_.start({});
   ASSERT_TRUE(eventually([this] { return daemon_.logged("start loop."); })) << daemon_.log();
   std::vector<std::unique_ptr<test::PlainClient>> clients;

@@ -68,7 +68,7 @@ class Connected : public ::testing::Test, public ListenerDelegate {
     acceptor_ = acceptor.get();
     server_ = std::make_unique<DBusServer>(
         DBusServerServices{limits_, counters_, log_, clock_, timers_, executor_, reactor_, entitlements_,
-                           "00112233445566778899aabbccddeeff"},
+                           budget_, "00112233445566778899aabbccddeeff"},
         std::move(acceptor));
     server_->setDelegate(*this);
     server_->resume();
@@ -118,6 +118,7 @@ class Connected : public ::testing::Test, public ListenerDelegate {
     limits.maxQueuedBytes = 20000;
     return limits;
   }();
+  UserBudget budget_{UserShares::of(limits_, uint64_t{1} << 30, 65536)};
   Counters counters_;
   MemoryLogSink sink_;
   Log log_{sink_, LogLevel::debug};
@@ -285,6 +286,43 @@ TEST_F(DBusConnectionTest, WaitsForRoomAndGoesOnWhereItStopped) {
     at += frame.size;
   }
   EXPECT_EQ(at, all.size());
+}
+
+TEST_F(DBusConnectionTest, EndsWhenTheRestOfAMessageDoesNotCome) {
+  shakeHands();
+  const std::string call = displayURLCalls(1);
+  say(call + call.substr(0, 20));
+  executor_.runAll();
+  EXPECT_EQ(session_->calls, 1);
+  timers_.advance(std::chrono::seconds(29));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 0);
+  timers_.advance(std::chrono::seconds(1));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_EQ(interruptions_, 1);
+  EXPECT_EQ(counters_.value(Reason::messageTimedOut), 1u);
+  EXPECT_TRUE(sink_.contains(LogLevel::normal, "the rest of a message did not come"));
+}
+
+TEST_F(DBusConnectionTest, GoesOnWhileEachMessageIsCompletedInTime) {
+  shakeHands();
+  const std::string call = displayURLCalls(1);
+  say(call.substr(0, 20));
+  executor_.runAll();
+  for (int i = 1; i <= 5; ++i) {
+    timers_.advance(std::chrono::seconds(20));
+    executor_.runAll();
+    say(call.substr(20) + call.substr(0, 20));
+    executor_.runAll();
+    ASSERT_EQ(session_->calls, i);
+  }
+  say(call.substr(20));
+  executor_.runAll();
+  timers_.advance(std::chrono::seconds(100));
+  executor_.runAll();
+  EXPECT_EQ(invalidations_, 0);
+  EXPECT_EQ(timers_.pending(), 0u) << "an idle connection has no timer";
 }
 
 TEST_F(DBusConnectionTest, PausesAClientThatDoesNotReadAndGoesOnAsItDoes) {
@@ -567,7 +605,8 @@ TEST_F(DBusConnectionTest, InvalidatingRightAfterFinishingWaitsForNothing) {
 }
 
 TEST(DBusServerInMemory, FreesConnectionsThatAreThereWhenItGoes) {
-  Limits limits;
+  const Limits limits;
+  UserBudget budget{UserShares::of(limits, uint64_t{1} << 30, 65536)};
   Counters counters;
   MemoryLogSink sink;
   Log log(sink, LogLevel::debug);
@@ -588,7 +627,7 @@ TEST(DBusServerInMemory, FreesConnectionsThatAreThereWhenItGoes) {
   auto acceptor = std::make_unique<MemoryAcceptor>();
   MemoryAcceptor* accepting = acceptor.get();
   auto server = std::make_unique<DBusServer>(
-      DBusServerServices{limits, counters, log, clock, timers, executor, reactor, entitlements, "id"},
+      DBusServerServices{limits, counters, log, clock, timers, executor, reactor, entitlements, budget, "id"},
       std::move(acceptor));
   server->setDelegate(keeper);
   server->resume();

@@ -10,6 +10,7 @@
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/UserBudget.h"
 #include "platform/fake/FakeBundle.h"
 #include "platform/fake/FakeConsent.h"
 #include "platform/fake/FakeDeviceProperties.h"
@@ -36,6 +37,7 @@ namespace kyt {
 
 struct TestPlatform {
   Limits limits;
+  UserBudget budget{UserShares::of(limits, uint64_t{8} << 30, 65536)};
   Counters counters;
   MemoryLogSink sink;
   Log log{sink, LogLevel::debug};
@@ -64,7 +66,7 @@ struct TestPlatform {
                     reactor,        executor,      random,        userDefaults, deviceProperties,
                     consent,        cryptography,  propertyLists, json,         deflate,
                     memory,         urlSessions,   udpSockets,    clientBundle, daemonBundle,
-                    fileExtensions, pluginBundles, powerLog};
+                    fileExtensions, pluginBundles, powerLog,      budget};
 
   DeviceIdentity deviceIdentity{platform};
   Environment environment{platform, deviceIdentity,

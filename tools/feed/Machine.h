@@ -9,6 +9,7 @@
 #include "platform/Counters.h"
 #include "platform/Limits.h"
 #include "platform/Platform.h"
+#include "platform/UserBudget.h"
 #include "platform/WorkerPool.h"
 #include "platform/linux/LinuxMemoryInfo.h"
 #include "platform/linux/LinuxRandom.h"
@@ -58,13 +59,14 @@ struct Machine {
   CurlURLSessionFactory urlSessions{CurlURLSessionOptions{}, log, counters};
   LinuxUDPSocketFactory udpSockets;
   NoBundle bundle;
-  LinuxFileExtensions fileExtensions{nullptr, log, counters};
+  UserBudget budget{UserShares::of(limits, ~uint64_t{0}, ~uint64_t{0})};
+  LinuxFileExtensions fileExtensions{nullptr, log, counters, budget};
   DlopenPluginBundles pluginBundles{"/nonexistent", log};
   JournalPowerLog powerLog{counters};
   Platform platform{
-      limits,       counters,         log,     clock,        *reactor,       *reactor,      workers, random,
-      userDefaults, deviceProperties, consent, cryptography, propertyLists,  json,          deflate, memory,
-      urlSessions,  udpSockets,       bundle,  bundle,       fileExtensions, pluginBundles, powerLog};
+      limits,       counters,         log,     clock,        *reactor,       *reactor,      workers,  random,
+      userDefaults, deviceProperties, consent, cryptography, propertyLists,  json,          deflate,  memory,
+      urlSessions,  udpSockets,       bundle,  bundle,       fileExtensions, pluginBundles, powerLog, budget};
   ~Machine() { end(); }
   // Nothing runs any more; what was counted stays.
   void end() {

@@ -18,8 +18,9 @@ namespace kyt {
 class LinuxFileExtensions::Access final : public FileAccess {
  public:
   Access(LinuxFileExtensions& owner, FileExtension extension)
-      : owner_(owner), extension_(std::move(extension)) {}
-  ~Access() override { owner_.giveBack(extension_.peer.user, counted_); }
+      : owner_(owner),
+        extension_(std::move(extension)),
+        counted_(owner_.budget_.account(extension_.peer.user), Share::uploadedBytes) {}
   Access(const Access&) = delete;
   Access& operator=(const Access&) = delete;
 
@@ -40,9 +41,8 @@ class LinuxFileExtensions::Access final : public FileAccess {
     const auto size = static_cast<uint64_t>(status.st_size);
     if (size > maxBytes) return FileReadError::tooLarge;
     if (size == 0) return Data();
-    holdsOnly(0);
-    if (!owner_.take(extension_.peer.user, size)) return FileReadError::tooMuchAtOnce;
-    counted_ = size;
+    counted_.clear();
+    if (!counted_.set(size)) return FileReadError::tooMuchAtOnce;
     std::byte* bytes = nullptr;
     Data data = Data::uninitialized(size, bytes);
     size_t done = 0;
@@ -58,9 +58,7 @@ class LinuxFileExtensions::Access final : public FileAccess {
   }
 
   void holdsOnly(uint64_t bytes) override {
-    if (bytes >= counted_) return;
-    owner_.giveBack(extension_.peer.user, counted_ - bytes);
-    counted_ = bytes;
+    if (bytes < counted_.amount()) counted_.setAnyway(bytes);
   }
 
   [[nodiscard]] bool remove(std::string_view name) override {
@@ -79,24 +77,8 @@ class LinuxFileExtensions::Access final : public FileAccess {
 
   LinuxFileExtensions& owner_;
   const FileExtension extension_;
-  uint64_t counted_ = 0;
+  Charge counted_;
 };
-
-bool LinuxFileExtensions::take(uint32_t user, uint64_t bytes) {
-  const MutexLock lock(mutex_);
-  uint64_t& held = bytesOfUsers_[user];
-  if (held != 0 && (held > mostOfOneUser_ || bytes > mostOfOneUser_ - held)) return false;
-  held += bytes;
-  return true;
-}
-
-void LinuxFileExtensions::giveBack(uint32_t user, uint64_t bytes) {
-  if (bytes == 0) return;
-  const MutexLock lock(mutex_);
-  const auto found = bytesOfUsers_.find(user);
-  found->second -= bytes;
-  if (found->second == 0) bytesOfUsers_.erase(found);
-}
 
 std::unique_ptr<FileAccess> LinuxFileExtensions::consume(std::string_view token,
                                                          std::optional<FileExtension>& extension) {

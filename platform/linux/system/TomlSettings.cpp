@@ -23,6 +23,19 @@ const char* setCount(const TomlNode& node, Settings& settings) {
   return nullptr;
 }
 
+template <std::optional<uint64_t> Limits::*field>
+const char* setShare(const TomlNode& node, Settings& settings) {
+  const std::string* text = node.text();
+  if (text != nullptr && *text == "auto") {
+    settings.limits.*field = std::nullopt;
+    return nullptr;
+  }
+  const auto* number = std::get_if<int64_t>(&node.value);
+  if (number == nullptr || *number < 1) return "must be \"auto\" or a whole number of at least 1";
+  settings.limits.*field = static_cast<uint64_t>(*number);
+  return nullptr;
+}
+
 template <double Limits::*field>
 const char* setSeconds(const TomlNode& node, Settings& settings) {
   constexpr double kMost = 365.0 * 86400;
@@ -103,6 +116,9 @@ constexpr Setting kSettings[] = {
     {"limits", "max_queued_bytes", setCount<&Limits::maxQueuedBytes>},
     {"limits", "max_connections", setCount<&Limits::maxConnections>},
     {"limits", "max_connections_per_user", setCount<&Limits::maxConnectionsPerUser>},
+    {"limits", "max_bytes_per_user", setShare<&Limits::maxBytesPerUser>},
+    {"limits", "max_descriptors_per_user", setShare<&Limits::maxDescriptorsPerUser>},
+    {"limits", "max_uploading_bytes_per_user", setShare<&Limits::maxUploadingBytesPerUser>},
     {"limits", "max_upload_bytes", setCount<&Limits::maxUploadBytes>},
     {"limits", "max_batch_bytes", setCount<&Limits::maxBatchBytes>},
     {"limits", "max_hierarchy_tokens_per_user", setCount<&Limits::maxHierarchyTokensPerUser>},

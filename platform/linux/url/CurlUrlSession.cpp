@@ -12,11 +12,12 @@ class CurlURLSession final : public URLSession {
 
   std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) override {
     const size_t charge = OutstandingBytes::of(request);
-    const auto refusal =
-        !state_->outstanding.take(charge) ? URLTransfer::Refusal::tooMuch : URLTransfer::Refusal::none;
+    OutstandingBytes::User& user = state_->outstanding.user(request.account);
+    const auto refusal = !user.take(charge) ? URLTransfer::Refusal::tooMuch : URLTransfer::Refusal::none;
     if (refusal == URLTransfer::Refusal::tooMuch)
       request = {};  // it is not kept until its completion has run
     auto transfer = std::make_shared<URLTransfer>(state_, std::move(request), std::move(completion));
+    transfer->user = &user;
     transfer->outstandingCharge = refusal == URLTransfer::Refusal::none ? charge : 0;
     transfer->refusal = state_->invalidated.load() ? URLTransfer::Refusal::invalidated : refusal;
     state_->used = true;

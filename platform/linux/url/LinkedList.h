@@ -1,5 +1,7 @@
-// A doubly linked list through its members: T has a field `Links<T> links`. Owns nothing.
+// A doubly linked list through its members: T has a field `Links<T> links`, or another that is named. Owns nothing.
 #pragma once
+
+#include <utility>
 
 namespace kyt {
 
@@ -9,22 +11,29 @@ struct Links {
   T* next = nullptr;
 };
 
-template <typename T>
+struct UsualLinks {
+  template <typename T>
+  static Links<T>& of(T& member) {
+    return member.links;
+  }
+};
+
+template <typename T, typename Which = UsualLinks>
 class LinkedList {
  public:
   [[nodiscard]] T* first() const { return first_; }
   [[nodiscard]] bool empty() const { return first_ == nullptr; }
 
   void append(T& member) {
-    member.links = {last_, nullptr};
-    (last_ != nullptr ? last_->links.next : first_) = &member;
+    Which::of(member) = {last_, nullptr};
+    (last_ != nullptr ? Which::of(*last_).next : first_) = &member;
     last_ = &member;
   }
 
   void remove(T& member) {
-    (member.links.previous != nullptr ? member.links.previous->links.next : first_) = member.links.next;
-    (member.links.next != nullptr ? member.links.next->links.previous : last_) = member.links.previous;
-    member.links = {};
+    const Links<T> links = std::exchange(Which::of(member), {});
+    (links.previous != nullptr ? Which::of(*links.previous).next : first_) = links.next;
+    (links.next != nullptr ? Which::of(*links.next).previous : last_) = links.previous;
   }
 
  private:

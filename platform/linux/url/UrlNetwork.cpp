@@ -366,7 +366,7 @@ void URLNetwork::finish(URLTransfer& transfer) {
   URLSessionState& session = *transfer.session;
   transfer.phase = URLTransfer::Phase::done;
   session.transfers.remove(transfer);
-  session.outstanding.giveBack(std::exchange(transfer.outstandingCharge, 0));
+  transfer.user->giveBack(std::exchange(transfer.outstandingCharge, 0));
   transfer.request.body = {};
   if (!session.queue) session.queue = SerialQueue::create("URL session", *workers_);
   const std::shared_ptr<SerialQueue> queue = session.queue;

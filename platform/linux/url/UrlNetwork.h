@@ -138,7 +138,7 @@ class URLNetwork {
   [[nodiscard]] bool retryOrWait(URLTransfer& transfer, CURLcode code, long systemError);
   [[nodiscard]] bool canLeave(const URLTransfer& transfer);
   void setAside(URLTransfer& transfer);
-  void displaceOldest(URLSessionState& session);
+  void displace(URLTransfer& oldest);
   void stopWaiting(URLTransfer& transfer);
   void listenForRoutes();
   void routesChanged();

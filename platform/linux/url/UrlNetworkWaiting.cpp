@@ -72,33 +72,41 @@ void URLNetwork::setAside(URLTransfer& transfer) {
   transfer.phase = URLTransfer::Phase::waiting;
   // Headers may be large too: they carry names that clients choose.
   transfer.waitingCharge = std::max(transfer.request.body.size() + transfer.headerSize(), kLeastCharge);
-  session.waitingBytes += transfer.waitingCharge;
+  WaitingRequests& waiting = session.waiting[transfer.user];
+  waiting.transfers.append(transfer);
+  waiting.bytes += transfer.waitingCharge;
   waiting_.fetch_add(1, std::memory_order_relaxed);
   waitingBodyBytes_.fetch_add(transfer.request.body.size(), std::memory_order_relaxed);
   armDeadline(transfer);
   const std::shared_ptr<URLSessionState> kept = transfer.session;  // displacing may end its last request
   const bool listening = routeEvents_.descriptor() >= 0;
-  while (session.waitingBytes > Limits::maxWaitingBytes) displaceOldest(session);
+  // The list ends with its last request, which one that is larger than the limit is too.
+  while (waiting.bytes > Limits::maxWaitingBytes) {
+    const bool last = waiting.transfers.first() == &transfer;
+    displace(*waiting.transfers.first());
+    if (last) break;
+  }
   listenForRoutes();
   if (listening) return;
   // What changed before the subscription was not announced.
   if (!settle_.isSet()) settle_.set(now_ + kSettleTime);
 }
 
-void URLNetwork::displaceOldest(URLSessionState& session) {
-  URLTransfer* oldest = session.transfers.first();
-  while (oldest->phase != URLTransfer::Phase::waiting) oldest = oldest->links.next;
+void URLNetwork::displace(URLTransfer& oldest) {
   displaced_.fetch_add(1, std::memory_order_relaxed);
   if (counters_.addAndMayLog(Reason::waitingRequestDisplaced, now_)) {
     log_.error(
         "CurlURLSession(setAside): more than %zu bytes wait for connectivity, dropping the oldest request",
         Limits::maxWaitingBytes);
   }
-  fail(*oldest, kURLErrorWaitingTooMuch, "Too much was waiting for connectivity");
+  fail(oldest, kURLErrorWaitingTooMuch, "Too much was waiting for connectivity");
 }
 
 void URLNetwork::stopWaiting(URLTransfer& transfer) {
-  transfer.session->waitingBytes -= std::exchange(transfer.waitingCharge, 0);
+  const auto waiting = transfer.session->waiting.find(transfer.user);
+  waiting->second.transfers.remove(transfer);
+  waiting->second.bytes -= std::exchange(transfer.waitingCharge, 0);
+  if (waiting->second.transfers.empty()) transfer.session->waiting.erase(waiting);
   waitingBodyBytes_.fetch_sub(transfer.request.body.size(), std::memory_order_relaxed);
   if (waiting_.fetch_sub(1, std::memory_order_relaxed) != 1) return;
   // Unsubscribing here would subscribe anew for each failed attempt: the slow timer does it when nothing

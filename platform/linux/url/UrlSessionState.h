@@ -4,6 +4,7 @@
 #pragma once
 
 #include <atomic>
+#include <map>
 #include <memory>
 
 #include "platform/SerialQueue.h"
@@ -15,6 +16,15 @@
 namespace kyt {
 
 class URLNetwork;
+
+// One user's requests that wait for connectivity, oldest first, and what they count towards the limit.
+struct WaitingRequests {
+  struct WaitingLinks {
+    static Links<URLTransfer>& of(URLTransfer& transfer) { return transfer.waitingLinks; }
+  };
+  LinkedList<URLTransfer, WaitingLinks> transfers;
+  size_t bytes = 0;
+};
 
 struct URLSessionState {
   URLSessionState(std::shared_ptr<URLNetwork> owner, URLSessionConfiguration wanted)
@@ -33,8 +43,8 @@ struct URLSessionState {
   std::shared_ptr<URLSessionState> self;  // while listed: connections end on the network thread alone
   Links<URLSessionState> links;           // among the sessions that have requests or connections
   LinkedList<URLTransfer> transfers;      // not yet completed, in the order in which they were started
-  size_t waitingBytes = 0;                // what those of them that wait count towards the limit
-  std::shared_ptr<SerialQueue> queue;     // runs completions; made for the first one
+  std::map<const OutstandingBytes::User*, WaitingRequests> waiting;  // those of them that wait, by user
+  std::shared_ptr<SerialQueue> queue;  // runs completions; made for the first one
   // Connections that may use cellular interfaces, and those that may not: never shared.
   std::unique_ptr<URLConnectionPool> pools[2];
 };

@@ -62,6 +62,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   bool foundEndedConnection =
       false;                 // the kept connection chosen for it was none any more, so it has not begun
   Links<URLTransfer> links;  // among its session's
+  Links<URLTransfer> waitingLinks;            // those of its user that wait, while it waits
   std::shared_ptr<URLTransfer> self;          // keeps it alive while the network thread has it
   CURL* handle = nullptr;                     // while active
   URLConnectionPool* pool = nullptr;          // while active
@@ -69,6 +70,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   URLConnection::Mark mark;                   // before its first byte
   size_t waitingCharge = 0;                   // while waiting
   size_t outstandingCharge = 0;               // until its result is set
+  OutstandingBytes::User* user = nullptr;     // its part of the session's account
   uint64_t routesWhenActivated = 0;           // the number of their last change
   MonotonicTime started, lastProgress;
   MonotonicTime latestEnd;  // of this attempt

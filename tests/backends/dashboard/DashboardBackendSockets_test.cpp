@@ -82,7 +82,8 @@ class DashboardSockets : public ::testing::Test {
                      fakes_.daemonBundle,
                      fakes_.fileExtensions,
                      fakes_.pluginBundles,
-                     fakes_.powerLog};
+                     fakes_.powerLog,
+                     fakes_.budget};
   UDPPeer server_;
   std::shared_ptr<DashboardBackend> backend_;
 };

@@ -191,6 +191,40 @@ TEST_F(HTTPSPostBackendBatch, ReachingTheThresholdInStatesZeroAndThreeDiscardsTh
   }
 }
 
+TEST_F(HTTPSPostBackendBatch, CountsTowardsItsUserUntilItIsARequestOrDiscarded) {
+  const auto account = platform_.budget.account(1000);
+  const auto holds = [&] { return account->holds(Share::bytes); };
+  backend().setUserAccount(account);
+  inState(kBackendStateEnabled);
+  send(5, {{"k", std::string(30000, 'x')}});
+  EXPECT_GT(holds(), 30000u);
+  flush();
+  EXPECT_EQ(holds(), 0u);
+  EXPECT_EQ(poster_->requests.at(0).account, account);
+  send(5, {{"k", std::string(30000, 'x')}});
+  backend().setState(kBackendStateDisabled);
+  flush();
+  EXPECT_EQ(holds(), 0u) << "discarded";
+  backend().setState(kBackendStateEnabled);
+  send(5, {{"k", std::string(30000, 'x')}});
+  EXPECT_GT(holds(), 30000u);
+  backend_.reset();
+  EXPECT_EQ(holds(), 0u) << "gone";
+}
+
+TEST_F(HTTPSPostBackendBatch, DropsEventsThatItsUserHasNoRoomFor) {
+  platform_.budget.shares()[Share::bytes] = 100000;
+  const auto account = platform_.budget.account(1000);
+  backend().setUserAccount(account);
+  inState(kBackendStateEnabled);
+  for (int i = 0; i < 10; ++i) send(5, {{"k", std::string(20000, 'x')}});
+  EXPECT_EQ(dropped(Reason::userBatchesFull), 7u) << "a quarter stays free";
+  EXPECT_EQ(platform_.sink.count(LogLevel::error, "HTTPSPostBackend(batchEvent): user 1000 holds "), 1u);
+  EXPECT_EQ(postedRecords(), 3u);
+  send(5, {{"k", std::string(20000, 'x')}});
+  EXPECT_EQ(postedRecords(), 1u);
+}
+
 TEST_F(HTTPSPostBackendBatch, AnEventDroppedFromAnEmptyBatchLeavesNothingToFlush) {
   platform_.limits.maxBatchBytes = 20000;
   inState(kBackendStateEnabled);

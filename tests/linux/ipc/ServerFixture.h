@@ -17,6 +17,7 @@
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
+#include "platform/UserBudget.h"
 #include "platform/WorkerPool.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/ipc/DBusServer.h"
@@ -135,15 +136,16 @@ class FixedEntitlements final : public Entitlements {
 
 class Server final : public ListenerDelegate {
  public:
-  explicit Server(Limits given = {}) : limits(given) {
+  explicit Server(Limits given = {})
+      : limits(given), budget(UserShares::of(given, uint64_t{1} << 30, 65536)) {
     char name[] = "/tmp/kyt-ipc-XXXXXX";
     folder = ::mkdtemp(name);
     path = folder + "/socket";
     reactor = EpollReactor::create();
     auto bound = UnixSocketAcceptor::bindAt(path);
-    listener = std::make_unique<DBusServer>(
-        DBusServerServices{limits, counters, log, clock, *reactor, pool, *reactor, entitlements, kMachineId},
-        std::move(std::get<0>(bound)));
+    listener = std::make_unique<DBusServer>(DBusServerServices{limits, counters, log, clock, *reactor, pool,
+                                                               *reactor, entitlements, budget, kMachineId},
+                                            std::move(std::get<0>(bound)));
     listener->setDelegate(*this);
     listener->resume();
   }
@@ -189,6 +191,7 @@ class Server final : public ListenerDelegate {
   [[nodiscard]] uint64_t counted(Reason reason) const { return counters.value(reason); }
 
   const Limits limits;
+  UserBudget budget;
   std::string folder, path;
   Counters counters;
   MemoryLogSink sink;

@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "platform/Counters.h"
+#include "platform/Limits.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/linux/base/Descriptors.h"
 #include "tests/support/Eventually.h"
@@ -65,9 +66,10 @@ class FileExtensionTest : public testing::Test {
   MemoryLogSink sink_;
   Log log_{sink_, LogLevel::debug};
   Counters counters_;
+  UserBudget budget_{UserShares::of(Limits(), uint64_t{1} << 30, 1024)};
   const std::unique_ptr<DeletionBroker> broker_ = startBroker();
   std::unique_ptr<LinuxFileExtensions> extensions_ =
-      std::make_unique<LinuxFileExtensions>(broker_.get(), log_, counters_);
+      std::make_unique<LinuxFileExtensions>(broker_.get(), log_, counters_, budget_);
 };
 
 TEST_F(FileExtensionTest, ReadsAndRemovesTheFileThatWasPassed) {
@@ -306,8 +308,11 @@ TEST_F(ChangingFile, CutAndGrownAllTheTimeGivesNothingThatWasNeverThere) {
   stop = true;
 }
 
-TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnceAndTheOnlyOneIsAlwaysRead) {
-  LinuxFileExtensions limited(broker_.get(), log_, counters_, 10);
+TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnce) {
+  Limits limits;
+  limits.maxUploadingBytesPerUser = 10;
+  UserBudget budget(UserShares::of(limits, 0, 0));
+  LinuxFileExtensions limited(broker_.get(), log_, counters_, budget);
   auto accessOf = [&, files = 0](uint32_t user, const std::string& text) mutable {
     const std::string path = folder_.write("f" + std::to_string(++files), text);
     std::optional<FileExtension> given =
@@ -319,8 +324,9 @@ TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnceAndTheOnlyOneIsAlwa
     const auto* error = std::get_if<FileReadError>(&read);
     return error != nullptr && *error == FileReadError::tooMuchAtOnce;
   };
-  auto large = accessOf(1, "more than ten bytes");
-  EXPECT_EQ(contents(*large), "more than ten bytes");
+  EXPECT_TRUE(refused(*accessOf(1, "more than ten bytes")));
+  auto large = accessOf(1, "ten  bytes");
+  EXPECT_EQ(contents(*large), "ten  bytes");
   const auto small = accessOf(1, "1");
   EXPECT_TRUE(refused(*small));
   const auto ofAnother = accessOf(2, "1234567890");
@@ -336,7 +342,7 @@ TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnceAndTheOnlyOneIsAlwa
 }
 
 TEST_F(FileExtensionTest, WithoutABrokerNothingIsRemovedAndItIsCounted) {
-  LinuxFileExtensions alone(nullptr, log_, counters_);
+  LinuxFileExtensions alone(nullptr, log_, counters_, budget_);
   auto given = extension(::open(folder_.write("a", "1").c_str(), O_RDONLY | O_CLOEXEC));
   const auto file = alone.consume("token", given);
   ASSERT_NE(file, nullptr);

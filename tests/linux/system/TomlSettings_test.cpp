@@ -38,6 +38,17 @@ TEST(TomlSettings, TheTwoHostsAreEnough) {
   EXPECT_EQ(settings.limits.idleExitSeconds, 30);
 }
 
+TEST(TomlSettings, AShareOfAUserMayBeLeftToTheMachine) {
+  const Settings settings = parsed(std::string(kHosts) + "[limits]\nmax_bytes_per_user = \"auto\"\n");
+  EXPECT_EQ(settings.limits.maxBytesPerUser, std::nullopt);
+  for (const char* wrong : {"0", "-1", "1.5", "\"all\"", "true"}) {
+    const auto read = parseSettings(std::string(kHosts) + "[limits]\nmax_bytes_per_user = " + wrong, "f");
+    ASSERT_TRUE(std::holds_alternative<TomlError>(read)) << wrong;
+    EXPECT_NE(std::get<TomlError>(read).text.find("must be \"auto\" or a whole number of at least 1"),
+              std::string::npos);
+  }
+}
+
 TEST(TomlSettings, EveryKeyIsTaken) {
   const Settings settings = parsed(std::string(kHosts) + R"(
 [tls]
@@ -53,6 +64,9 @@ max_upload_bytes = 15
 max_batch_bytes = 16
 max_hierarchy_tokens_per_user = 17
 max_shared_data_bytes_per_user = 18
+max_bytes_per_user = 19
+max_descriptors_per_user = 20
+max_uploading_bytes_per_user = 21
 [service]
 idle_exit_seconds = 1.5
 shutdown_grace_seconds = 2
@@ -69,6 +83,9 @@ target = "stderr"
   EXPECT_EQ(settings.limits.maxBatchBytes, 16u);
   EXPECT_EQ(settings.limits.maxHierarchyTokensPerUser, 17u);
   EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 18u);
+  EXPECT_EQ(settings.limits.maxBytesPerUser, 19u);
+  EXPECT_EQ(settings.limits.maxDescriptorsPerUser, 20u);
+  EXPECT_EQ(settings.limits.maxUploadingBytesPerUser, 21u);
   EXPECT_EQ(settings.limits.idleExitSeconds, 1.5);
   EXPECT_EQ(settings.limits.shutdownGraceSeconds, 2.0);
   EXPECT_EQ(settings.logTarget, LogTarget::standardError);

@@ -3,6 +3,8 @@
 #include <filesystem>
 #include <fstream>
 
+#include "platform/Limits.h"
+#include "platform/UserBudget.h"
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 #include "tests/support/NetworkNamespace.h"
 
@@ -207,6 +209,35 @@ TEST_F(CurlURLSessionConnectivity, DropsTheOldestWhenTooMuchOfASessionWaits) {
   }
   ASSERT_TRUE(unaffected.wait());
   EXPECT_EQ(unaffected.status(), 200);
+}
+
+// Single messages of all users share a session.
+TEST_F(CurlURLSessionConnectivity, DropsTheOldestOfTheUserOfWhomTooMuchWaits) {
+  UserBudget budget(UserShares::of(Limits(), uint64_t{8} << 30, 1024));
+  auto urls = session(true);
+  const auto start = [&](uint32_t user, size_t bytes, Outcome& outcome) {
+    URLRequest request = post(server_->url("/"), std::string(bytes, 'b'));
+    request.account = budget.account(user);
+    urls->start(std::move(request), outcome.completion());
+  };
+  Outcome first, last;
+  start(1, 1000, first);
+  std::vector<Outcome> outcomes(26);
+  for (Outcome& outcome : outcomes) start(2, 900000, outcome);
+  start(1, 1000, last);
+  for (size_t i = 0; i < 8; ++i) {
+    ASSERT_TRUE(outcomes[i].wait());
+    EXPECT_EQ(outcomes[i].errorCode(), kURLErrorWaitingTooMuch);
+  }
+  ASSERT_TRUE(waitUntilWaiting(20));
+  EXPECT_FALSE(first.isDone());
+  EXPECT_FALSE(last.isDone());
+  ASSERT_TRUE(restoreRoute());
+  ASSERT_TRUE(first.wait() && last.wait());
+  EXPECT_EQ(first.status(), 200) << first.errorText();
+  EXPECT_EQ(last.status(), 200) << last.errorText();
+  EXPECT_TRUE(eventually([&] { return factory().outstanding() == 0; }));
+  EXPECT_TRUE(budget.account(2)->holdsNothing());
 }
 
 TEST_F(CurlURLSessionConnectivity, CountsHeadersTowardsWhatWaits) {

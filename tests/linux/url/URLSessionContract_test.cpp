@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "platform/Limits.h"
+#include "platform/UserBudget.h"
 #include "platform/WorkerPool.h"
 #include "platform/fake/FakeUrlSession.h"
 #include "tests/linux/url/CurlUrlSessionFixture.h"
@@ -276,6 +277,33 @@ TYPED_TEST(URLSessionContract, RefusesWhatWouldMakeTooMuchOutstanding) {
     ASSERT_TRUE(outcome.wait());
     EXPECT_EQ(outcome.errorText(), "");
   }
+  EXPECT_EQ(this->factory().figures().refused, 1u);
+}
+
+TYPED_TEST(URLSessionContract, RefusesTheUserOfWhomTooMuchIsOutstanding) {
+  Limits limits;
+  limits.maxBytesPerUser = 3u << 20;
+  UserBudget budget(UserShares::of(limits, 0, 0));
+  auto urls = this->factory().create({}), other = this->factory().create({});
+  const auto start = [&](URLSession& session, uint32_t user, size_t bytes, Outcome& outcome) {
+    URLRequest request = this->request(std::string(bytes, 'x'));
+    request.account = budget.account(user);
+    session.start(std::move(request), outcome.completion());
+  };
+  Outcome first, second, refused, ofAnother;
+  start(*urls, 1, 1u << 20, first);
+  start(*other, 1, 1u << 20, second);  // of all its sessions
+  start(*urls, 1, 1u << 20, refused);  // an eighth is for others than requests
+  ASSERT_TRUE(refused.wait());
+  EXPECT_EQ(refused.errorCode(), kURLErrorOutstandingTooMuch);
+  start(*urls, 2, 1u << 20, ofAnother);
+  this->implementation_.answerAll();
+  for (Outcome* outcome : {&first, &second, &ofAnother}) {
+    ASSERT_TRUE(outcome->wait());
+    EXPECT_EQ(outcome->errorText(), "");
+  }
+  EXPECT_TRUE(this->drained());
+  EXPECT_TRUE(budget.account(1)->holdsNothing());
   EXPECT_EQ(this->factory().figures().refused, 1u);
 }
 

@@ -1,0 +1,246 @@
+// Clients of one user that take all they can get of the daemon, and another user's events beside them: none is lost,
+// and each is answered as if the former were not there.
+#include <grp.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <csignal>
+#include <cstdio>
+#include <functional>
+#include <memory>
+#include <vector>
+
+#include "tests/integration/HierarchyFixture.h"
+#include "tests/support/PlainClient.h"
+
+namespace kyt {
+namespace {
+
+using test::PlainClient;
+
+constexpr uid_t kNobody = 65534;
+
+// A process of another user that does its worst, says so, and stays until it is killed.
+class Attacker {
+ public:
+  Attacker(const std::string& socket, const std::function<void(const std::string& socket)>& work) {
+    int ends[2];
+    if (::pipe(ends) != 0) return;
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      if (::setgroups(0, nullptr) != 0 || ::setgid(kNobody) != 0 || ::setuid(kNobody) != 0) ::_exit(126);
+      work(socket);
+      static_cast<void>(::write(ends[1], "x", 1));
+      for (;;) ::pause();
+    }
+    ::close(ends[1]);
+    done_ = ends[0];
+  }
+  ~Attacker() {
+    if (pid_ > 0) {
+      ::kill(pid_, SIGKILL);
+      static_cast<void>(::waitpid(pid_, nullptr, 0));
+    }
+    ::close(done_);
+  }
+  Attacker(const Attacker&) = delete;
+  Attacker& operator=(const Attacker&) = delete;
+  [[nodiscard]] bool isDone(std::chrono::milliseconds patience = std::chrono::seconds(0)) const {
+    pollfd waiting{done_, POLLIN, 0};
+    return ::poll(&waiting, 1, static_cast<int>(patience.count())) == 1;
+  }
+
+ private:
+  pid_t pid_ = 0;
+  int done_ = -1;
+};
+
+// Connections that the daemon may end at any time.
+std::vector<std::unique_ptr<PlainClient>>& kept() {
+  static std::vector<std::unique_ptr<PlainClient>> connections;
+  return connections;
+}
+
+std::string manyIntrospections(size_t bytes) {
+  std::string calls;
+  MessageWriter writer(calls);
+  for (uint32_t serial = 1; calls.size() < bytes; ++serial) {
+    writer.beginCall(serial, {.path = "/com/vantu/kytreportingd",
+                              .interface = "org.freedesktop.DBus.Introspectable",
+                              .member = "Introspect"});
+    static_cast<void>(writer.end());
+  }
+  return calls;
+}
+
+// Reads nothing, and stops sending when the daemon stops reading.
+void sendWhatIsTaken(const PlainClient& client, std::string_view bytes) {
+  while (!bytes.empty()) {
+    pollfd waiting{client.descriptor(), POLLOUT, 0};
+    if (::poll(&waiting, 1, 100) <= 0) return;
+    const ssize_t sent = ::send(client.descriptor(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (sent <= 0) return;
+    bytes.remove_prefix(static_cast<size_t>(sent));
+  }
+}
+
+void raiseDescriptorLimit() {
+  rlimit limit = {};
+  ::getrlimit(RLIMIT_NOFILE, &limit);
+  limit.rlim_cur = limit.rlim_max;
+  ::setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+class AttackedDaemon : public HierarchyTest {
+ protected:
+  static constexpr int kCategory = 10;
+  struct Latency {
+    double median, p99, worst;  // milliseconds
+  };
+
+  void start(const std::string& limits) {
+    if (::geteuid() != 0) GTEST_SKIP() << "a client of another user needs root";
+    tools::Stage::Options options;
+    options.extraSettings = limits;
+    lay(std::move(options));
+    ASSERT_FALSE(tools::writeFile(
+        stage_->folder() + "/etc/kytreportingd/entitlements.d/nobody.toml",
+        "[[grant]]\nuser = " + std::to_string(kNobody) + "\n\"com.vantu.private.kytreportingd\" = true\n",
+        0644));
+    putBag("cadmor", {entry("victim"), entry("hostile")});
+    startDaemon();
+    std::filesystem::permissions(stage_->folder(), std::filesystem::perms(0755));
+    victim_ = open("victim", -1, 1);
+  }
+  // So many events, each taken by the daemon before the next.
+  Latency eventsOfTheVictim(int count, const char* when) {
+    std::vector<double> milliseconds;
+    for (int i = 0; i < count; ++i) {
+      const auto begin = std::chrono::steady_clock::now();
+      sendAndSettle(*victim_, kCategory, R"({"k":1})");
+      milliseconds.push_back(
+          std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - begin).count());
+    }
+    sent_ += count;
+    std::sort(milliseconds.begin(), milliseconds.end());
+    const auto at = [&](double part) {
+      return milliseconds[static_cast<size_t>(part * static_cast<double>(milliseconds.size() - 1))];
+    };
+    const Latency latency{at(0.5), at(0.99), milliseconds.back()};
+    std::printf("%s: median %.2f ms, 99 of 100 within %.2f ms, worst %.2f ms\n", when, latency.median,
+                latency.p99, latency.worst);
+    return latency;
+  }
+  // Nothing of the victim's is missing, and its connection has never ended.
+  void expectNothingLost() {
+    finish(*victim_);
+    EXPECT_TRUE(arrive("client=victim&method=" + std::to_string(kCategory), sent_)) << daemonLog();
+    EXPECT_EQ(arrived("client=victim&method=" + std::to_string(kCategory)), sent_);
+  }
+  [[nodiscard]] long anonymousKiB() const {
+    std::ifstream status("/proc/" + std::to_string(stage_->daemon()->pid()) + "/status");
+    for (std::string line; std::getline(status, line);)
+      if (line.starts_with("RssAnon:")) return std::stol(line.substr(8));
+    return 0;
+  }
+  [[nodiscard]] size_t descriptors() const {
+    size_t count = 0;
+    const std::string folder = "/proc/" + std::to_string(stage_->daemon()->pid()) + "/fd";
+    for (const auto& each : std::filesystem::directory_iterator(folder)) count += each.exists() ? 1 : 1;
+    return count;
+  }
+  // While the attack goes on, whatever the other clients of this machine do meanwhile.
+  void expectBearable(const Latency& before, const Latency& during) {
+    EXPECT_LT(during.p99, 2 * before.p99 + 500);
+  }
+
+  Process victim_;
+  int sent_ = 0;
+};
+
+TEST_F(AttackedDaemon, KeepsItsMemoryFromClientsThatReadNoReplies) {
+  start("[limits]\nmax_bytes_per_user = 16777216\n");
+  if (IsSkipped()) return;
+  const Latency before = eventsOfTheVictim(100, "alone");
+  const Attacker attacker(socket(), [](const std::string& path) {
+    raiseDescriptorLimit();
+    const std::string calls = manyIntrospections(140000);
+    for (int i = 0; i < 300; ++i) {
+      auto client = std::make_unique<PlainClient>(path);
+      if (client->connected() && client->shakeHands()) sendWhatIsTaken(*client, calls);
+      kept().push_back(std::move(client));
+    }
+  });
+  long most = 0;
+  Latency during = eventsOfTheVictim(100, "attacked");
+  for (int round = 0; round < 600 && !attacker.isDone(std::chrono::milliseconds(100)); ++round)
+    most = std::max(most, anonymousKiB());
+  EXPECT_TRUE(attacker.isDone());
+  most = std::max(most, anonymousKiB());
+  expectBearable(before, during);
+  std::printf("the daemon: %ld KiB at most\n", most);
+  EXPECT_LT(most, 96 * 1024);
+  EXPECT_TRUE(logged("ends, it reads nothing")) << daemonLog();
+  expectNothingLost();
+}
+
+TEST_F(AttackedDaemon, KeepsItsDescriptorsFromClientsThatDoNotFinishTheirMessages) {
+  start("[limits]\nmax_descriptors_per_user = 1000\n");
+  if (IsSkipped()) return;
+  const Latency before = eventsOfTheVictim(100, "alone");
+  const size_t descriptorsBefore = descriptors();
+  const Attacker attacker(socket(), [](const std::string& path) {
+    raiseDescriptorLimit();
+    std::string half = manyIntrospections(1);
+    half.resize(half.size() - 10);
+    for (int i = 0; i < 200; ++i) {
+      auto client = std::make_unique<PlainClient>(path);
+      if (client->connected() && client->shakeHands()) client->send(half, std::vector<int>(16, 0));
+      kept().push_back(std::move(client));
+    }
+  });
+  const Latency during = eventsOfTheVictim(100, "attacked");
+  EXPECT_TRUE(attacker.isDone(std::chrono::seconds(60)));
+  const size_t held = descriptors();
+  std::printf("the daemon: %zu descriptors, %zu before\n", held, descriptorsBefore);
+  EXPECT_GT(held, descriptorsBefore + 500) << "the attack took place";
+  EXPECT_LT(held, descriptorsBefore + 1000 + 50);
+  EXPECT_TRUE(logged("its user's clients hold too many descriptors")) << daemonLog();
+  expectBearable(before, during);
+  expectNothingLost();
+}
+
+TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
+  start("[limits]\nmax_bytes_per_user = 16777216\n");
+  if (IsSkipped()) return;
+  std::filesystem::copy(stage_->program("kytctl"), stage_->folder() + "/kytctl");
+  const Latency before = eventsOfTheVictim(100, "alone");
+  std::vector<Process> hostile;
+  for (int i = 0; i < 10; ++i) {
+    hostile.push_back(std::make_unique<ScriptedClient>(
+        stage_->folder() + "/kytctl", std::vector<std::string>{"--socket", socket()}, kNobody));
+    hostile.back()->step(opening("hostile", -1, 100 + i));
+    EXPECT_EQ(hostile.back()->ask(R"({"do":"configure"})"), "live: httppost");
+  }
+  Latency during{};
+  for (int round = 0; round < 20; ++round) {
+    for (const Process& client : hostile)
+      client->step("{\"do\":\"send\",\"category\":9,\"type\":1,\"repeat\":50,\"payload\":{\"t\":\"" +
+                   std::string(4000, 'x') + "\"}}");
+    if (round == 19) during = eventsOfTheVictim(100, "attacked");
+    for (const Process& client : hostile)
+      EXPECT_EQ(client->ask(R"({"do":"displayURL"})"), "https://display.example.org/");
+  }
+  const long most = anonymousKiB();
+  std::printf("the daemon: %ld KiB\n", most);
+  EXPECT_LT(most, 32 * 1024);
+  EXPECT_TRUE(logged("HTTPSPostBackend(batchEvent): user 65534 holds ")) << daemonLog();
+  expectBearable(before, during);
+  for (const Process& client : hostile) client->kill();
+  expectNothingLost();
+}
+
+}  // namespace
+}  // namespace kyt
