@@ -21,6 +21,7 @@
 #include "platform/linux/system/LinuxConfinement.h"
 #include "platform/linux/system/LogSinks.h"
 #include "platform/linux/system/MachineResources.h"
+#include "platform/linux/system/MemoryReserve.h"
 #include "platform/linux/system/Process.h"
 #include "platform/linux/system/ProgramInspector.h"
 #include "platform/linux/system/ServiceManager.h"
@@ -31,6 +32,7 @@ namespace kyt {
 namespace {
 
 constexpr int kCouldNotStart = 1;
+constexpr int kOutOfMemory = 1;
 constexpr int kNotConfined = -1;
 constexpr uint32_t kPublicFolder = 0755;   // clients look the socket up in it
 constexpr uint32_t kPrivateFolder = 0750;  // identifiers, and what was sent
@@ -137,6 +139,7 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
   }
+  const MemoryReserve reserve(stopSignals);
   std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
   if (reactor == nullptr) {
     log.error("main: Cannot start the reactor");
@@ -151,14 +154,18 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
   ServiceManager::ready("Listening");
   static_cast<void>(giveBackCodePages());
   const int signal = waitForTheEnd(stopSignals, log);
-  endProcessAtTheLatest(lastMoment(settings.limits), 0);
-  if (signal != 0)
+  endProcessAtTheLatest(lastMoment(settings.limits), reserve.isUsed() ? kOutOfMemory : 0);
+  if (reserve.isUsed())
+    log.error("main: Ending, the system refuses memory");
+  else if (signal != 0)
     log.normal("main: Ending on signal %d", signal);
   else
     log.normal("main: Ending, idle for %g seconds", settings.limits.idleExitSeconds);
   ServiceManager::stopping();
-  if (!services.shutDown()) std::_Exit(0);  // threads that do not end use all that would be destroyed here
-  return 0;
+  const bool ended = services.shutDown();
+  const int status = reserve.isUsed() ? kOutOfMemory : 0;
+  if (!ended) std::_Exit(status);  // threads that do not end use all that would be destroyed here
+  return status;
 }
 
 }  // namespace
