@@ -9,6 +9,7 @@
 #include "platform/Platform.h"
 #include "platform/SerialQueue.h"
 #include "platform/System.h"
+#include "platform/UserBudget.h"
 #include "platform/UserDefaults.h"
 
 namespace kyt {
@@ -163,7 +164,8 @@ String KYTReportingBackend::persistentIdentifier(std::string_view key, const Str
   if (const String* identifier = stored.string()) return *identifier;
   return platform_.userDefaults.stringOrStore(
       kKYTReportingDefaultsDomain, key,
-      made != nullptr ? *made : String(uuidText(platform_.random.uuidBytes())));
+      made != nullptr ? *made : String(uuidText(platform_.random.uuidBytes())),
+      userAccount_ ? std::optional(userAccount_->user()) : std::nullopt);
 }
 
 }  // namespace kyt

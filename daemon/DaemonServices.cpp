@@ -33,6 +33,13 @@ CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
   return options;
 }
 
+TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const Limits& limits) {
+  TomlUserDefaultsOptions options;
+  options.folder = paths.userDefaults();
+  options.mostIdentifiersOfAUser = limits.maxCustomIdentifiersPerUser;
+  return options;
+}
+
 DeviceSources deviceSources(const Paths& paths) {
   DeviceSources sources;
   sources.overrides = paths.device();
@@ -96,7 +103,7 @@ DaemonServices::DaemonServices(Start start)
       budget_(UserShares::of(settings_.limits, start.memory, start.descriptors)),
       reactor_(std::move(start.reactor)),
       workers_(workerPoolOptions(counters_, log_)),
-      userDefaults_({start.paths.userDefaults()}, log_, counters_, clock_),
+      userDefaults_(userDefaultsOptions(start.paths, settings_.limits), log_, counters_, clock_),
       deviceProperties_(deviceSources(start.paths), cryptography_, log_, clock_),
       consent_(userDefaults_),
       clientBundle_(start.paths.clientBundle(), log_),
@@ -120,6 +127,7 @@ DaemonServices::DaemonServices(Start start)
       fetcher_(configuration_, backendClassLock_),
       sessionClass_(configuration_, backendFactory_, messageLog_),
       queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),
+      lineLimits_(log_, clock_, *reactor_, queue_),
       transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *reactor_, queue_,
                    [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),
@@ -182,6 +190,7 @@ bool DaemonServices::shutDown() {
     reactor_->stop();
   else
     log_.error("shutDown: Threads still wait for what clients passed, ending without them");
+  lineLimits_.finish();
   logFigures();
   return threadsEnd;
 }

@@ -16,6 +16,7 @@
 #include "daemon/ReportingdAgent.h"
 #include "platform/Counters.h"
 #include "platform/Entitlements.h"
+#include "platform/LineLimits.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "platform/Paths.h"
@@ -128,6 +129,7 @@ class DaemonServices {
   ReportingdSessionClass sessionClass_;
   std::atomic<bool> resumed_{false};
   std::shared_ptr<SerialQueue> queue_;  // the daemon's own
+  LineLimits lineLimits_;
   LinuxProcessTransaction transaction_;
   ReportingdAgent agent_;
   DBusServer listener_;

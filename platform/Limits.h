@@ -18,6 +18,7 @@ struct Limits {
   uint64_t maxBatchBytes = 16777216;      // one back end's batch; then new events are dropped
   uint64_t maxHierarchyTokensPerUser = 4096;      // tokens' arrays stay for the life of the process
   uint64_t maxSharedDataBytesPerUser = 16777216;  // so does their shared data
+  uint64_t maxCustomIdentifiersPerUser = 250;     // of the 1,000 that are kept for good
   // Of one user's clients together; without a value a part of the memory and the descriptors there are
   // (platform/UserBudget.h).
   std::optional<uint64_t> maxBytesPerUser;           // memory, but for files that are uploaded
@@ -63,6 +64,8 @@ struct Limits {
   static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
   static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them
   static constexpr size_t maxQueuedLogBytes = 1u << 20;  // lines that wait for whoever reads standard error
+  // Of one text, above the debug level, for the clients of one user: the journal's own limit would hit everybody.
+  static constexpr unsigned maxLogLinesPerSecond = 200;
   static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };

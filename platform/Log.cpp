@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "platform/Limits.h"
+#include "platform/LineLimits.h"
 
 namespace kyt {
 
@@ -17,8 +18,15 @@ void Log::debug(const char* format, ...) {
   va_end(arguments);
 }
 
+bool Log::isTooMuch(const char* format) const {
+  const std::optional<uint32_t> user = ClientScope::user();
+  if (!user) return false;
+  LineLimits* const limits = lineLimits_.load(std::memory_order_acquire);
+  return limits != nullptr && !limits->admits(*user, format);
+}
+
 void Log::normal(const char* format, ...) {
-  if (!enabled(LogLevel::normal)) return;
+  if (!enabled(LogLevel::normal) || isTooMuch(format)) return;
   va_list arguments;
   va_start(arguments, format);
   write(LogLevel::normal, format, arguments);
@@ -26,7 +34,7 @@ void Log::normal(const char* format, ...) {
 }
 
 void Log::error(const char* format, ...) {
-  if (!enabled(LogLevel::error)) return;
+  if (!enabled(LogLevel::error) || isTooMuch(format)) return;
   va_list arguments;
   va_start(arguments, format);
   write(LogLevel::error, format, arguments);

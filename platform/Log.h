@@ -16,6 +16,8 @@
 
 namespace kyt {
 
+class LineLimits;
+
 enum class LogLevel : int {
   debug = 0,
   normal = 1,
@@ -42,6 +44,8 @@ class Log {
   // Only before other threads exist.
   void setSink(LogSink& sink) { sink_ = &sink; }
   void allowThreads() { sink_->allowThreads(); }
+  // Asked before each line above the debug level that a thread writes for a client (ClientScope); null: nobody.
+  void setLineLimits(LineLimits* limits) { lineLimits_.store(limits, std::memory_order_release); }
   [[nodiscard]] bool enabled(LogLevel level) const {
     return static_cast<int>(level) >= level_.load(std::memory_order_relaxed);
   }
@@ -58,7 +62,9 @@ class Log {
   void write(LogLevel level, const char* format, va_list arguments) __attribute__((format(printf, 3, 0)));
   // `line`: all `whole` bytes of it, or more than are shown.
   void writeLine(LogLevel level, std::string line, size_t whole);
+  [[nodiscard]] bool isTooMuch(const char* format) const;
   LogSink* sink_;
+  std::atomic<LineLimits*> lineLimits_{nullptr};
   std::atomic<int> level_;
 };
 

@@ -108,4 +108,12 @@ bool isPlainText(std::string_view text) {
   return escapedText(text).size() == text.size();
 }
 
+std::string beginningOf(std::string_view text) {
+  constexpr size_t kShort = 12, kShown = 8;
+  if (text.size() <= kShort) return std::string(text);
+  size_t end = kShown;
+  while (end > 0 && (static_cast<unsigned char>(text[end]) & 0xC0) == 0x80) --end;  // not within a character
+  return std::string(text.substr(0, end)) + "...";
+}
+
 }  // namespace kyt

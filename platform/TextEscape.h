@@ -21,4 +21,8 @@ void appendEscaped(std::string& out, std::string_view text);
 [[nodiscard]] size_t utf8SequenceLength(std::string_view text);
 [[nodiscard]] bool isValidUTF8(std::string_view text);
 
+// The beginning of a text that gives its reader a right or follows a person, enough to tell such texts apart in a log:
+// eight bytes and "..."; a text of twelve bytes or less is too short for that, and stays.
+[[nodiscard]] std::string beginningOf(std::string_view text);
+
 }  // namespace kyt

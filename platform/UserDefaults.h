@@ -4,8 +4,10 @@
 // thread; reads block for a stat() at most, and for a small file read after a change; set() for a write and rename.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string_view>
+#include <utility>
 
 #include "platform/Error.h"
 #include "platform/Value.h"
@@ -25,8 +27,13 @@ class UserDefaults {
   [[nodiscard]] virtual std::optional<Error> set(std::string_view domain, std::string_view key,
                                                  Value value) = 0;
   // Stores `value` unless the key already has a string; answers what is stored afterwards, also under concurrent
-  // callers of other processes. On an error answers `value`, unstored (counted and logged by the adapter).
-  [[nodiscard]] virtual String stringOrStore(std::string_view domain, std::string_view key, String value) = 0;
+  // callers of other processes. On an error answers `value`, unstored (counted and logged by the adapter). `owner` is the
+  // user for whose client it is made, who has a share of the identifiers that are kept; none: the daemon's own.
+  [[nodiscard]] virtual String stringOrStore(std::string_view domain, std::string_view key, String value,
+                                             std::optional<uint32_t> owner) = 0;
+  [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value) {
+    return stringOrStore(domain, key, std::move(value), std::nullopt);
+  }
 };
 
 }  // namespace kyt

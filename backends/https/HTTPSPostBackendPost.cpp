@@ -12,8 +12,10 @@
 #include "platform/Cryptography.h"
 #include "platform/DataServices.h"
 #include "platform/Keys.h"
+#include "platform/LineLimits.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/UserBudget.h"
 
 namespace kyt {
 
@@ -48,8 +50,10 @@ struct Reply {
   FlushCompletion completion;
   size_t events;
   std::string address;  // without what a "?" begins
+  std::shared_ptr<UserAccount> account;
 
   void operator()(std::optional<Data>, std::optional<URLResponse> response, std::optional<Error> error) {
+    const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
     const int status = response ? response->status : 0;
     const bool redirected = status >= 300 && status <= 399;
     const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
@@ -228,8 +232,8 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
   }
   std::string address = request.url.substr(0, request.url.find('?'));
   delegate->postURLRequestWithCompletionHandler(
-      std::move(request),
-      Reply{weak_from_this(), platform_, name_, std::move(completion), events, std::move(address)});
+      std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion), events,
+                                std::move(address), userAccount_});
 }
 
 }  // namespace kyt

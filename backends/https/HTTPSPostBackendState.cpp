@@ -9,6 +9,7 @@
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/TextEscape.h"
 
 namespace kyt {
 
@@ -300,7 +301,7 @@ String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Cl
     madeIdentifiers_.emplace_back(key, identifier);
   }
   platform_.log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
-                       identifier.c_str());
+                       beginningOf(identifier).c_str());
   return identifier;
 }
 

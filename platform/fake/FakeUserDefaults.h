@@ -54,8 +54,9 @@ class FakeUserDefaults final : public UserDefaults {
     }
     return std::nullopt;
   }
-  [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value) override
-      EXCLUDES(mutex_) {
+  using UserDefaults::stringOrStore;
+  [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value,
+                                     std::optional<uint32_t> /*owner*/) override EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
     std::pair name{std::string(domain), std::string(key)};
     auto found = values_.find(name);

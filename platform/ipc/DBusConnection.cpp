@@ -7,6 +7,7 @@
 #include "platform/Clock.h"
 #include "platform/Entitlements.h"
 #include "platform/Limits.h"
+#include "platform/LineLimits.h"
 #include "platform/Log.h"
 
 namespace kyt {
@@ -57,6 +58,7 @@ void DBusConnection::start() {
   handshakeTimer_ = context_->services.timers.after(patience, queue_, [weak = weak_from_this()] {
     const auto self = weak.lock();
     if (!self || !self->handshake_ || self->ended_) return;
+    const ClientScope scope(self->user_);
     self->breakOff(Reason::handshakeTimedOut, "the handshake took too long");
     self->end(true, false);
   });
@@ -120,6 +122,7 @@ DBusConnection::Step DBusConnection::breakOff(Reason reason, const char* problem
 // The end. Runs on the queue; the second call does nothing.
 void DBusConnection::end(bool broken, bool waitForOutput) {
   if (closed() || std::exchange(ended_, true)) return;
+  const ClientScope scope(user_);
   invalidating_ = true;
   handshakeTimer_.cancel();
   messageTimer_.cancel();

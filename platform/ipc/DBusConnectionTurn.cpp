@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/Limits.h"
+#include "platform/LineLimits.h"
 #include "platform/ipc/DBusConnection.h"
 
 namespace kyt {
@@ -33,6 +34,7 @@ class HeldOutput {
 }  // namespace
 
 void DBusConnection::turn() {
+  const ClientScope scope(user_);
   turnScheduled_ = false;
   if (closed()) return;
   if (ended_) {
@@ -72,6 +74,7 @@ void DBusConnection::watchBegunMessage() {
 }
 
 void DBusConnection::messageTookTooLong() {
+  const ClientScope scope(user_);
   messageTimed_ = false;
   if (ended_ || closed()) return;
   // A client that is not read from cannot finish its message.

@@ -238,6 +238,17 @@ TEST_F(AgentHierarchy, ConfigurationBringsStatesAndCombinedIDsDown) {
   EXPECT_EQ(childBackend->combinedSessionIDString(), String(id(parent) + "." + id(child)));
 }
 
+TEST_F(AgentHierarchy, ATokenIsShownByItsBeginningAlone) {
+  const std::string token = "0123456789abcdef0123456789abcdef";
+  Client child = clientWith(sessionInfoAt(2, token.c_str(), 8));
+  configure(child);
+  EXPECT_TRUE(logged(LogLevel::normal,
+                     "parentSessionForChild: Unable to find session with hierarchy of 1 for hierarchyToken "
+                     "'01234567...'"));
+  EXPECT_FALSE(logged(LogLevel::normal, token));
+  EXPECT_FALSE(logged(LogLevel::error, token));
+}
+
 TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
   test_.budget.shares()[Share::hierarchyTokens] = 2;
   clientWith(sessionInfoAt(0, "A"));
@@ -258,7 +269,7 @@ TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
 }
 
 TEST_F(AgentHierarchy, ATokenCountsOnceHoweverManySessionsJoinItAndHoweverOften) {
-  test_.limits.maxHierarchyTokensPerUser = 2;
+  test_.budget.shares()[Share::hierarchyTokens] = 2;
   Client a = clientWith(sessionInfoAt(0, "A")), child = clientWith(sessionInfoAt(1, "A"));
   identify(child, sessionInfoAt(1, "A"));
   const Client other = clientWith(sessionInfoAt(0, "B"));

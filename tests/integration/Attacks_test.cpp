@@ -21,6 +21,7 @@ namespace {
 using test::PlainClient;
 
 constexpr uid_t kNobody = 65534;
+constexpr int kTorvel = 5;
 
 // A process of another user that does its worst, says so, and stays until it is killed.
 class Attacker {
@@ -239,6 +240,72 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
   EXPECT_TRUE(logged("HTTPSPostBackend(batchEvent): user 65534 holds ")) << daemonLog();
   expectBearable(before, during);
   for (const Process& client : hostile) client->kill();
+  expectNothingLost();
+}
+
+TEST_F(AttackedDaemon, KeepsItsLogFromAClientThatFloodsIt) {
+  start("");
+  if (IsSkipped()) return;
+  const Latency before = eventsOfTheVictim(100, "alone");
+  const std::string line = "updateCorrelatedSessions: Session 77 has no correlated sessions";
+  const Attacker attacker(socket(), [](const std::string& path) {
+    PlainClient client(path);
+    if (!client.shakeHands()) return;
+    for (int i = 0; i < 20000; ++i)
+      client.call(
+          "SetSessionInfo", "a{sv}aa{sv}avb",
+          [](MessageWriter& out) {
+            out.writeDictionary(Dictionary{{kKYTReportingSessionInfoSessionID, 77},
+                                           {kKYTReportingSessionInfoClientType, 20}});
+            out.writeOptionalDictionary(std::nullopt);
+            out.writeOptionalValue(nullptr);
+            out.writeBoolean(false);
+          },
+          false);
+    client.call("FetchDisplayURL");
+    static_cast<void>(client.receiveText());
+  });
+  const auto begin = std::chrono::steady_clock::now();
+  const Latency during = eventsOfTheVictim(100, "attacked");
+  ASSERT_TRUE(attacker.isDone(std::chrono::seconds(120)));
+  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+  EXPECT_TRUE(eventually([&] { return logged("lines of clients of user 65534 left out"); })) << daemonLog();
+  const size_t lines = countLogged(line);
+  std::printf("%zu of 20000 lines in %.1f seconds\n", lines, seconds);
+  EXPECT_GE(lines, 200u) << "the attack took place";
+  EXPECT_LE(static_cast<double>(lines), 200 * (seconds + 2));
+  expectBearable(before, during);
+  expectNothingLost();
+}
+
+TEST_F(AttackedDaemon, KeepsIdentifiersForTheProgramsOfOthers) {
+  start("[limits]\nmax_custom_identifiers_per_user = 5\n");
+  if (IsSkipped()) return;
+  Array entries{entry("victim")};
+  for (int i = 0; i < 20; ++i) {
+    Dictionary hostile = entry("hostile" + std::to_string(i));
+    hostile.set("custom_clientId", true);
+    entries.append(hostile);
+  }
+  Dictionary late = entry("late");
+  late.set("custom_clientId", true);
+  entries.append(late);
+  putBag("torvel", entries);
+  std::filesystem::copy(stage_->program("kytctl"), stage_->folder() + "/kytctl");
+  for (int i = 0; i < 20; ++i) {
+    ScriptedClient client(stage_->folder() + "/kytctl", {"--socket", socket()}, kNobody);
+    client.step(opening("hostile" + std::to_string(i), -1, 100 + i, false, kTorvel));
+    EXPECT_EQ(client.ask(R"({"do":"configure"})"), "live: httppost") << daemonLog();
+  }
+  EXPECT_TRUE(logged("there are 5 custom identifiers of user 65534 already")) << daemonLog();
+  const Process program = process();
+  program->step(opening("late", -1, 200, false, kTorvel));
+  EXPECT_EQ(program->ask(R"({"do":"configure"})"), "live: httppost") << daemonLog();
+  const std::string defaults =
+      contents(stage_->folder() + "/var/lib/kytreportingd/defaults/com.vantu.kytreporting.toml");
+  EXPECT_NE(defaults.find("uuid:late:test"), std::string::npos) << defaults;
+  EXPECT_NE(defaults.find("\"uuidOwner:hostile4:test\" = 65534"), std::string::npos) << defaults;
+  EXPECT_EQ(defaults.find("uuid:hostile5:test"), std::string::npos) << defaults;
   expectNothingLost();
 }
 

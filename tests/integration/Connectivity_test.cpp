@@ -1,14 +1,19 @@
 // The whole daemon in a network of its own that the tests cut and restore: what waits for a route, and what waits for
 // another network than the cellular one.
+#include <grp.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <string>
 
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/TestClient.h"
+#include "tests/support/ChildProcess.h"
 #include "tests/support/NetworkNamespace.h"
+#include "tests/support/PlainClient.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
@@ -197,6 +202,66 @@ TEST_F(Connectivity, WhatStillWaitsIsGivenUpWhenTheDaemonEnds) {
   EXPECT_TRUE(daemon_->logged("shutDown: Cancelling 1 requests that have not been answered in time"))
       << daemon_->log();
   started_ = false;
+}
+
+// They share one connection pool, but neither what may wait nor what may be unanswered.
+TEST_F(Connectivity, SingleMessagesOfOneUserDoNotDisplaceAnothersWhileThereIsNoRoute) {
+  constexpr uid_t kNobody = 65534;
+  ASSERT_TRUE(route("add", "eth7"));
+  serveBag(false);
+  daemon_->root().write(
+      "etc/kytreportingd/entitlements.d/nobody.toml",
+      "[[grant]]\nuser = " + std::to_string(kNobody) + "\n\"com.vantu.private.kytreportingd\" = true\n");
+  startDaemon();
+  std::filesystem::permissions(daemon_->root().path(), std::filesystem::perms(0755));
+  ASSERT_TRUE(there_->run("ip route add default via 10.77.0.2"));
+  const auto sendSingle = [](test::PlainClient& client, uint32_t bytes) {
+    std::string noise(bytes, 'x');  // that gzip cannot make small
+    uint32_t state = 1;
+    for (char& c : noise) {
+      state = state * 1664525 + 1013904223;
+      c = static_cast<char>('0' + (state >> 24) % 64);
+    }
+    client.call("SendMessageWithSessionInfo", "a{sv}aa{sv}qqaa{sv}", [&](MessageWriter& out) {
+      out.writeDictionary(Dictionary{{kKYTReportingSessionInfoSessionID, 1},
+                                     {kKYTReportingSessionInfoClientType, kTorvel},
+                                     {kKYTReportingSessionInfoRequireUserInfo, true}});
+      out.writeOptionalDictionary(
+          Dictionary{{kKYTReportingUserInfoClientName, "plain"}, {kKYTReportingUserInfoServiceName, "test"}});
+      out.writeUInt16(10);
+      out.writeUInt16(1);
+      out.writeOptionalDictionary(Dictionary{{"t", noise}});
+    });
+    return client.receiveText();
+  };
+  test::PlainClient victim(daemon_->socketPath());
+  ASSERT_TRUE(victim.shakeHands());
+  ASSERT_EQ(sendSingle(victim, 100), "finished");
+  ASSERT_TRUE(eventually([&] { return posts("plain") == 1; })) << daemon_->log();
+  ASSERT_TRUE(route("del", "eth7"));
+  server_->closeConnections();
+  for (int i = 0; i < 5; ++i) ASSERT_EQ(sendSingle(victim, 100), "finished");
+  const std::string failure = inChildProcess([&]() -> std::string {
+    if (::setgroups(0, nullptr) != 0 || ::setgid(kNobody) != 0 || ::setuid(kNobody) != 0)
+      return "no other user";
+    test::PlainClient hostile(daemon_->socketPath());
+    if (!hostile.shakeHands()) return "refused";
+    for (int i = 0; i < 40; ++i)
+      if (sendSingle(hostile, 900000) != "finished") return "not finished";
+    return "";
+  });
+  EXPECT_EQ(failure, "");
+  EXPECT_TRUE(eventually([&] {
+    return daemon_->logged("bytes wait for connectivity, dropping the oldest request");
+  })) << daemon_->log();
+  ASSERT_TRUE(route("add", "eth7"));
+  const auto small = [&] {
+    size_t count = 0;
+    for (const auto& request : server_->requests())
+      count += request.method == "POST" && request.body.size() < 10000 ? 1 : 0;
+    return count;
+  };
+  EXPECT_TRUE(eventually([&] { return small() == 6; })) << small();
 }
 
 }  // namespace

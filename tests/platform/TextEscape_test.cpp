@@ -50,5 +50,13 @@ TEST(TextEscape, TellsValidUTF8FromInvalid) {
   EXPECT_FALSE(isValidUTF8("\xf0\x8f\xbf\xbf"));
 }
 
+TEST(BeginningOf, TellsLongTextsApartAndLeavesShortOnes) {
+  EXPECT_EQ(beginningOf("4f1c"), "4f1c");
+  EXPECT_EQ(beginningOf("123456789012"), "123456789012");
+  EXPECT_EQ(beginningOf("0123456789abcdef0123456789abcdef"), "01234567...");
+  EXPECT_EQ(beginningOf("1234567\u00e9\u00e9\u00e9\u00e9"), "1234567...") << "no half of a character";
+  EXPECT_EQ(beginningOf(std::string(20, '\x80')), "...");
+}
+
 }  // namespace
 }  // namespace kyt

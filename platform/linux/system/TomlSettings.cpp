@@ -123,6 +123,7 @@ constexpr Setting kSettings[] = {
     {"limits", "max_batch_bytes", setCount<&Limits::maxBatchBytes>},
     {"limits", "max_hierarchy_tokens_per_user", setCount<&Limits::maxHierarchyTokensPerUser>},
     {"limits", "max_shared_data_bytes_per_user", setCount<&Limits::maxSharedDataBytesPerUser>},
+    {"limits", "max_custom_identifiers_per_user", setCount<&Limits::maxCustomIdentifiersPerUser>},
     {"service", "idle_exit_seconds", setSeconds<&Limits::idleExitSeconds>},
     {"service", "shutdown_grace_seconds", setSeconds<&Limits::shutdownGraceSeconds>},
     {"log", "target", setLogTarget},

@@ -15,12 +15,26 @@ namespace kyt {
 namespace {
 
 constexpr std::string_view kIdentifierPrefix = "uuid:";
+constexpr std::string_view kOwnerPrefix = "uuidOwner:";
 
 Error failure(int code, std::string text) {
   return Error{"KYTUserDefaultsErrorDomain", code, std::move(text)};
 }
 Error systemFailure(int error, const std::string& what) {
   return failure(error, what + ": " + errorText(error));
+}
+
+std::string identifierOwnedBy(std::string_view ownerKey) {
+  return std::string(kIdentifierPrefix).append(ownerKey.substr(kOwnerPrefix.size()));
+}
+
+std::optional<std::string> withOwner(std::string_view text, std::string_view file,
+                                     std::string_view identifier, uint32_t owner) {
+  const auto parsed = parseFlatToml(text, file);
+  const auto* content = std::get_if<FlatToml>(&parsed);
+  if (content == nullptr) return std::nullopt;
+  const std::string key = std::string(kOwnerPrefix).append(identifier.substr(kIdentifierPrefix.size()));
+  return content->textWith(key, Value(static_cast<long>(owner)));
 }
 
 // Takes the owner and group of `like` as far as this process may; who may not give files away keeps its own.
@@ -91,12 +105,13 @@ std::optional<Error> TomlUserDefaults::set(std::string_view domain, std::string_
   return std::nullopt;
 }
 
-String TomlUserDefaults::stringOrStore(std::string_view domain, std::string_view key, String value) {
+String TomlUserDefaults::stringOrStore(std::string_view domain, std::string_view key, String value,
+                                       std::optional<uint32_t> owner) {
   const Value known = this->value(domain, key);
   if (known.string() != nullptr) return *known.string();
   const BlockingScope blocking;
   const GateLock lock(writing_);
-  auto result = store(domain, key, Value(value), Mode::keepString);
+  auto result = store(domain, key, Value(value), Mode::keepString, owner);
   if (const auto* error = std::get_if<Error>(&result)) {
     if (counters_.addAndMayLog(Reason::customIdentifierRefused, clock_.monotonic())) {
       log_.error("userDefaults: An identifier was not stored: %s", error->localizedDescription.c_str());
@@ -137,8 +152,26 @@ std::variant<FileHandle, Error> TomlUserDefaults::lockDomain(const std::string& 
   return file;
 }
 
+// Identifiers whose owner is not known, from before owners were noted or made by hand, count for nobody.
+std::optional<Error> TomlUserDefaults::refusalOfAnother(const FlatToml& content,
+                                                        std::optional<uint32_t> owner) const {
+  if (content.countWithPrefix(kIdentifierPrefix) >= Limits::maxCustomIdentifiers)
+    return failure(
+        E2BIG, "there are " + std::to_string(Limits::maxCustomIdentifiers) + " custom identifiers already");
+  if (!owner) return std::nullopt;
+  size_t theirs = 0;
+  for (auto entry = content.entries.lower_bound(kOwnerPrefix);
+       entry != content.entries.end() && entry->first.starts_with(kOwnerPrefix); ++entry) {
+    const bool owns = entry->second.value == Value(static_cast<long>(*owner));
+    if (owns && content.entries.contains(identifierOwnedBy(entry->first))) ++theirs;
+  }
+  if (theirs < options_.mostIdentifiersOfAUser) return std::nullopt;
+  return failure(E2BIG, "there are " + std::to_string(theirs) + " custom identifiers of user " +
+                            std::to_string(*owner) + " already");
+}
+
 std::variant<Value, Error> TomlUserDefaults::store(std::string_view domainName, std::string_view key,
-                                                   Value value, Mode mode) {
+                                                   Value value, Mode mode, std::optional<uint32_t> owner) {
   const std::string domain(domainName);
   if (!isDomainName(domain)) return failure(EINVAL, "\"" + domain + "\" is no domain name");
   const bool isIdentifier = key.starts_with(kIdentifierPrefix) && !value.isNull();
@@ -167,12 +200,11 @@ std::variant<Value, Error> TomlUserDefaults::store(std::string_view domainName, 
   const Value known = content.value(key);
   if (mode == Mode::keepString && known.string() != nullptr) return known;
   if (value.isNull() && known.isNull()) return value;
-  if (isIdentifier && known.isNull() &&
-      content.countWithPrefix(kIdentifierPrefix) >= Limits::maxCustomIdentifiers) {
-    return failure(
-        E2BIG, "there are " + std::to_string(Limits::maxCustomIdentifiers) + " custom identifiers already");
-  }
-  const auto text = content.textWith(key, value);
+  const bool isNew = isIdentifier && known.isNull();
+  if (isNew)
+    if (auto error = refusalOfAnother(content, owner)) return std::move(*error);
+  auto text = content.textWith(key, value);
+  if (text && isNew && owner) text = withOwner(*text, file, key, *owner);
   if (!text)
     return failure(EINVAL, "such a value or key cannot be stored, or the file would become too large");
   if (auto error = replaceFile(domain, *text)) return std::move(*error);

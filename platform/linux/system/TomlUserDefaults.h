@@ -10,7 +10,8 @@
 // A file that may not be read, cannot be parsed or is not flat answers nothing, is counted and logged once for
 // each of its states, and is never overwritten. What the machine refuses for a moment (FlatToml.h) changes nothing but
 // for a line. At most Limits::maxCustomIdentifiers keys "uuid:…" are
-// stored, each of at most kMaxIdentifierKey bytes, since clients choose their names.
+// stored, each of at most kMaxIdentifierKey bytes, since clients choose their names; for one user's clients only some of
+// them. Beside each stands for whom it was made: "uuidOwner:…" with the user's number, in the same replacement.
 #pragma once
 
 #include <map>
@@ -22,6 +23,7 @@
 #include "platform/Clock.h"
 #include "platform/Counters.h"
 #include "platform/Gate.h"
+#include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "platform/UserDefaults.h"
@@ -35,6 +37,7 @@ struct TomlUserDefaultsOptions {
   // For tests: told the name of each step of a replacement as it is reached.
   void (*step)(const char* name) = nullptr;
   Duration lockPause = std::chrono::seconds(60);  // how long it is not waited for again
+  size_t mostIdentifiersOfAUser = Limits::maxCustomIdentifiers;
 };
 
 class TomlUserDefaults final : public UserDefaults {
@@ -47,8 +50,9 @@ class TomlUserDefaults final : public UserDefaults {
   [[nodiscard]] Value value(std::string_view domain, std::string_view key) override EXCLUDES(mutex_);
   [[nodiscard]] std::optional<Error> set(std::string_view domain, std::string_view key, Value value) override
       EXCLUDES(writing_);
-  [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value) override
-      EXCLUDES(mutex_, writing_);
+  using UserDefaults::stringOrStore;
+  [[nodiscard]] String stringOrStore(std::string_view domain, std::string_view key, String value,
+                                     std::optional<uint32_t> owner) override EXCLUDES(mutex_, writing_);
 
   // All values of a domain, by key.
   [[nodiscard]] Dictionary values(std::string_view domain) EXCLUDES(mutex_);
@@ -59,8 +63,10 @@ class TomlUserDefaults final : public UserDefaults {
  private:
   enum class Mode { replace, keepString };
   // What is stored afterwards, or an error.
-  std::variant<Value, Error> store(std::string_view domain, std::string_view key, Value value, Mode mode)
-      REQUIRES(writing_);
+  std::variant<Value, Error> store(std::string_view domain, std::string_view key, Value value, Mode mode,
+                                   std::optional<uint32_t> owner = std::nullopt) REQUIRES(writing_);
+  [[nodiscard]] std::optional<Error> refusalOfAnother(const FlatToml& content,
+                                                      std::optional<uint32_t> owner) const;
   std::optional<Error> replaceFile(const std::string& domain, std::string_view text) REQUIRES(writing_);
   const FlatToml& current(std::string_view domain) REQUIRES(mutex_);
   std::variant<FileHandle, Error> lockDomain(const std::string& domain) REQUIRES(writing_);

@@ -406,10 +406,10 @@ TEST_F(HTTPSPostBackendState, TheCustomIdentifierIsMadeOnceForClientAndService) 
   const Value stored = platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b");
   ASSERT_NE(stored.string(), nullptr);
   EXPECT_EQ(stored.string()->size(), 36u);
-  EXPECT_TRUE(logged(
-      ("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:a:b: " + stored.string()->str())
-          .c_str(),
-      LogLevel::normal));
+  EXPECT_TRUE(logged(("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:a:b: " +
+                      stored.string()->str().substr(0, 8) + "...")
+                         .c_str(),
+                     LogLevel::normal));
   backend_.reset();
   decide();
   EXPECT_EQ(platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"), stored);
@@ -422,15 +422,11 @@ TEST_F(HTTPSPostBackendState, ACustomIdentifierThatCannotBeStoredStaysTheSameFor
             {"filters", Array{}},
             {"sampling_threshold", 1.0}};
   const auto identifierOf = [&](const char* client) {
-    const std::string begin =
-        std::string("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:") + client + ":b: ";
     backend().setUserInfoDict(
         Dictionary{{kKYTReportingUserInfoClientName, client}, {kKYTReportingUserInfoServiceName, "b"}});
     backend().updateState();
-    std::string last;
-    for (const auto& line : platform_.sink.lines())
-      if (line.line.starts_with(begin)) last = line.line.substr(begin.size());
-    return last;
+    const auto message = platform_.json.parse(*backend().createMessageForPostAndLogging(Array{}, nullptr));
+    return std::get<Value>(message).dictionary()->find("clientId")->string()->str();
   };
   const std::string first = identifierOf("a"), other = identifierOf("z");
   EXPECT_EQ(first.size(), 36u);

@@ -67,6 +67,7 @@ max_shared_data_bytes_per_user = 18
 max_bytes_per_user = 19
 max_descriptors_per_user = 20
 max_uploading_bytes_per_user = 21
+max_custom_identifiers_per_user = 22
 [service]
 idle_exit_seconds = 1.5
 shutdown_grace_seconds = 2
@@ -86,6 +87,7 @@ target = "stderr"
   EXPECT_EQ(settings.limits.maxBytesPerUser, 19u);
   EXPECT_EQ(settings.limits.maxDescriptorsPerUser, 20u);
   EXPECT_EQ(settings.limits.maxUploadingBytesPerUser, 21u);
+  EXPECT_EQ(settings.limits.maxCustomIdentifiersPerUser, 22u);
   EXPECT_EQ(settings.limits.idleExitSeconds, 1.5);
   EXPECT_EQ(settings.limits.shutdownGraceSeconds, 2.0);
   EXPECT_EQ(settings.logTarget, LogTarget::standardError);

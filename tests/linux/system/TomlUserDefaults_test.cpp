@@ -252,6 +252,32 @@ TEST_F(TomlUserDefaultsTest, RefusesIdentifiersPastTheLimitAndCountsThem) {
   EXPECT_EQ(defaults.value(kDomain, "uuidRespectDnu"), Value("own"));
 }
 
+TEST_F(TomlUserDefaultsTest, OneUserHasAShareOfTheIdentifiersForGood) {
+  TomlUserDefaultsOptions options{folder_.path()};
+  options.mostIdentifiersOfAUser = 3;
+  const auto store = [&](TomlUserDefaults& defaults, const std::string& key, std::optional<uint32_t> owner) {
+    static_cast<void>(defaults.stringOrStore(kDomain, key, String("x"), owner));
+    return !defaults.value(kDomain, key).isNull();
+  };
+  {
+    TomlUserDefaults defaults(options, log_, counters_, clock_);
+    for (int i = 0; i < 3; ++i) EXPECT_TRUE(store(defaults, "uuid:a" + std::to_string(i) + ":", 1000));
+  }
+  TomlUserDefaults defaults(options, log_, counters_, clock_);  // as after a restart
+  EXPECT_FALSE(store(defaults, "uuid:new:", 1000));
+  EXPECT_EQ(counters_.value(Reason::customIdentifierRefused), 1u);
+  EXPECT_EQ(sink_.count(LogLevel::error, "there are 3 custom identifiers of user 1000 already"), 1u);
+  EXPECT_TRUE(store(defaults, "uuid:new:", 1001)) << "another user's";
+  EXPECT_TRUE(store(defaults, "uuid:own:", std::nullopt)) << "nobody's";
+  EXPECT_EQ(defaults.value(kDomain, "uuidOwner:a0:"), Value(1000));
+  EXPECT_EQ(defaults.value(kDomain, "uuidOwner:new:"), Value(1001));
+  EXPECT_TRUE(defaults.value(kDomain, "uuidOwner:own:").isNull());
+  // What an administrator deletes is free again.
+  EXPECT_EQ(defaults.set(kDomain, "uuid:a1:", Value()), std::nullopt);
+  EXPECT_TRUE(store(defaults, "uuid:newer:", 1000));
+  EXPECT_FALSE(store(defaults, "uuid:newest:", 1000));
+}
+
 TEST_F(TomlUserDefaultsTest, RefusesAnIdentifierWithAVeryLongName) {
   auto defaults = make();
   const std::string key = "uuid:" + std::string(TomlUserDefaults::kMaxIdentifierKey, 'n');
