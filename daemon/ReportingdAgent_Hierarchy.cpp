@@ -8,7 +8,6 @@
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/TextEscape.h"
 #include "platform/UserBudget.h"
 #include "session/ReportingdSession.h"
 
@@ -114,12 +113,12 @@ std::optional<AncestorIdentifiers> ReportingdAgent::parentSessionIDStringForSess
   const HierarchyGroup* sessions = group(token);
   if (sessions == nullptr || sessions->empty()) {
     log.error("parentSessionIDStringForSession: ERROR: No sessions found for hierarchyToken %s",
-              beginningOf(*token).c_str());
+              log.shownIdentifier(*token).c_str());
     return std::nullopt;
   }
   if (!isIn(*sessions, *token, session)) {
     log.normal("parentSessionIDStringForSession: Session %u not found for hierarchyToken %s",
-               session.sessionID(), beginningOf(*token).c_str());
+               session.sessionID(), log.shownIdentifier(*token).c_str());
     return std::nullopt;
   }
   HierarchyGroup::Ancestors ancestors = sessions->ancestorsOf(level);
@@ -143,18 +142,18 @@ std::shared_ptr<ReportingdSession> ReportingdAgent::parentSessionForChild(Report
   const HierarchyGroup* sessions = group(token);
   if (sessions == nullptr || sessions->empty()) {
     log.error("parentSessionForChild: ERROR: No sessions found for hierarchyToken %s",
-              beginningOf(*token).c_str());
+              log.shownIdentifier(*token).c_str());
     return nullptr;
   }
   if (!isIn(*sessions, *token, session)) {
     log.error("parentSessionForChild: ERROR: Session %u not found for hierarchyToken %s", session.sessionID(),
-              beginningOf(*token).c_str());
+              log.shownIdentifier(*token).c_str());
     return nullptr;
   }
   std::shared_ptr<ReportingdSession> parent = sessions->getFirstSessionWithHierarchy(level - 1);
   if (parent == nullptr)
     log.normal("parentSessionForChild: Unable to find session with hierarchy of %d for hierarchyToken '%s'",
-               static_cast<int>(level - 1), beginningOf(*token).c_str());
+               static_cast<int>(level - 1), log.shownIdentifier(*token).c_str());
   return parent;
 }
 

@@ -7,8 +7,13 @@
 
 #include "platform/Limits.h"
 #include "platform/LineLimits.h"
+#include "platform/TextEscape.h"
 
 namespace kyt {
+
+std::string Log::shownIdentifier(std::string_view identifier) const {
+  return debugEnabled() ? std::string(identifier) : beginningOf(identifier);
+}
 
 void Log::debug(const char* format, ...) {
   if (!enabled(LogLevel::debug)) return;

@@ -50,6 +50,9 @@ class Log {
     return static_cast<int>(level) >= level_.load(std::memory_order_relaxed);
   }
   [[nodiscard]] bool debugEnabled() const { return enabled(LogLevel::debug); }
+  // An identifier that gives its reader a right or follows a person, for lines above the debug level: its beginning, or
+  // all of it where debug lines are written, since these show it anyway.
+  [[nodiscard]] std::string shownIdentifier(std::string_view identifier) const;
 
   void debug(const char* format, ...) __attribute__((format(printf, 2, 3)));
   void normal(const char* format, ...) __attribute__((format(printf, 2, 3)));  // the level "default"

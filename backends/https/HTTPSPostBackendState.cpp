@@ -9,7 +9,6 @@
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/TextEscape.h"
 
 namespace kyt {
 
@@ -301,7 +300,7 @@ String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Cl
     madeIdentifiers_.emplace_back(key, identifier);
   }
   platform_.log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
-                       beginningOf(identifier).c_str());
+                       platform_.log.shownIdentifier(identifier).c_str());
   return identifier;
 }
 

@@ -238,8 +238,13 @@ TEST_F(AgentHierarchy, ConfigurationBringsStatesAndCombinedIDsDown) {
   EXPECT_EQ(childBackend->combinedSessionIDString(), String(id(parent) + "." + id(child)));
 }
 
-TEST_F(AgentHierarchy, ATokenIsShownByItsBeginningAlone) {
+TEST_F(AgentHierarchy, ATokenIsShownByItsBeginningAloneUnlessDebugLinesShowItAnyway) {
   const std::string token = "0123456789abcdef0123456789abcdef";
+  Client first = clientWith(sessionInfoAt(2, token.c_str(), 7));
+  configure(first);
+  EXPECT_TRUE(logged(LogLevel::normal, "hierarchy of 1 for hierarchyToken '" + token + "'"));
+  test_.log.setLevel(LogLevel::normal);
+  test_.sink.clear();
   Client child = clientWith(sessionInfoAt(2, token.c_str(), 8));
   configure(child);
   EXPECT_TRUE(logged(LogLevel::normal,

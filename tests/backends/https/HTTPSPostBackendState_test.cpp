@@ -406,10 +406,10 @@ TEST_F(HTTPSPostBackendState, TheCustomIdentifierIsMadeOnceForClientAndService) 
   const Value stored = platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b");
   ASSERT_NE(stored.string(), nullptr);
   EXPECT_EQ(stored.string()->size(), 36u);
-  EXPECT_TRUE(logged(("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:a:b: " +
-                      stored.string()->str().substr(0, 8) + "...")
-                         .c_str(),
-                     LogLevel::normal));
+  EXPECT_TRUE(logged(
+      ("getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:a:b: " + stored.string()->str())
+          .c_str(),
+      LogLevel::normal));
   backend_.reset();
   decide();
   EXPECT_EQ(platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"), stored);
