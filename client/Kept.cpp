@@ -48,7 +48,7 @@ std::string Kept::whyNoStorebag() const {
   if (type->longLongValue() < kFirstTypeWithStorebag)
     return "client type " + number + " has no storebag: types 5 to 23 have one";
   return "the daemon has no storebag for client type " + number +
-         ": its log says why it could not be fetched or verified";
+         ", or one that names no back end: its log says why it could not be fetched or verified, or that it names none";
 }
 
 std::string Kept::whyNotLive() const {

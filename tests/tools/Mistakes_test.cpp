@@ -48,7 +48,12 @@ TEST_F(Mistakes, NoEntitlementIsToldByTheLog) {
   lay();
   std::filesystem::remove(stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml");
   startDaemon();
-  EXPECT_EQ(send().status, 1);
+  const ProgramRun refused = send();
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_NE(
+      refused.text.find("the daemon refuses this user and program (kytctl entitlements check says why)"),
+      std::string::npos)
+      << refused.text;
   expectTold("listener: Refused connection ");
   expectTold("no grant gives it the entitlement, see \"kytctl entitlements check --user ");
 }
@@ -71,6 +76,16 @@ TEST_F(Mistakes, AClientTypeWithoutStorebagIsToldByTheLog) {
   EXPECT_EQ(sent.status, 1);
   expectTold("Messages of session 1, client type 4, are dropped: there is no storebag for this client type");
   expectCounted("no-storebag");
+}
+
+TEST_F(Mistakes, AStorebagThatNamesNoBackEndIsToldByTheLog) {
+  lay();
+  ASSERT_FALSE(stage_->putStorebag(
+      "cadmor", Dictionary{{"version", "1"}, {"release", Dictionary{{"httpost", Dictionary()}}}}));
+  startDaemon();
+  EXPECT_EQ(session(kSend).text, "no storebag\n") << "the library cannot tell the two apart";
+  expectTold("Messages of session 1, client type 20, are dropped: the storebag names no back end for it");
+  expectCounted("no-back-ends");
 }
 
 TEST_F(Mistakes, AStorebagThatTheServerDoesNotHaveIsToldByTheLog) {

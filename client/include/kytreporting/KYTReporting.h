@@ -100,7 +100,7 @@ class KYT_EXPORT KYTReporting {
     noDaemon = 0,       // no connection: no socket, nobody listens, or the connection ended
     refused = 1,        // the daemon does not serve this program, or the session's information is wrong
     connected = 2,      // connected, and not configured yet: the daemon drops what is sent
-    noStorebag = 3,     // configured, without a storebag: the daemon drops what is sent
+    noStorebag = 3,     // configured; no storebag, or one without back ends: the daemon drops all
     noLiveBackEnd = 4,  // configured, and no back end takes events
     live = 5,           // at least one back end takes events (filters and sampling may still leave some out)
   };
@@ -168,7 +168,7 @@ class KYT_EXPORT KYTReporting {
   using SuccessCompletion = Function<void(bool, std::optional<Error>)>;
 
   // Asks the daemon to configure the session from its storebag. The completion gets the names of the live
-  // back ends; none (and no error) when there is no storebag. May be empty.
+  // back ends; none (and no error) without a storebag, or with one that names no back end. May be empty.
   void startConfiguration(StatesCompletion completion = nullptr);
   // New user information; none: as it was.
   void fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion = nullptr);

@@ -80,7 +80,7 @@ typedef enum kyt_state {
   KYT_STATE_NO_DAEMON = 0,        /* no connection: no socket, nobody listens, or the connection ended */
   KYT_STATE_REFUSED = 1,          /* the daemon does not serve this program, or the information is wrong */
   KYT_STATE_CONNECTED = 2,        /* connected, and not configured yet: the daemon drops what is sent */
-  KYT_STATE_NO_STOREBAG = 3,      /* configured, without a storebag: the daemon drops what is sent */
+  KYT_STATE_NO_STOREBAG = 3,      /* configured; no storebag, or one without back ends: all is dropped */
   KYT_STATE_NO_LIVE_BACK_END = 4, /* configured, and no back end takes events */
   KYT_STATE_LIVE = 5              /* at least one back end takes events */
 } kyt_state;
