@@ -128,6 +128,8 @@ const char* reasonName(Reason reason) {
       return "log-line-dropped";
     case Reason::messageLogLineLost:
       return "message-log-line-lost";
+    case Reason::messageLogShareUsed:
+      return "message-log-share-used";
     case Reason::valueNotPostable:
       return "value-not-postable";
     case Reason::fileNotRemoved:

@@ -67,6 +67,8 @@ struct Limits {
   // Of one text, above the debug level, for the clients of one user: the journal's own limit would hit everybody.
   static constexpr unsigned maxLogLinesPerSecond = 200;
   static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk
+  static constexpr uint64_t maxMessageLogBytesPerUser =
+      maxMessageLogBytes / 4;                           // … nor push out others' lines
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };
 

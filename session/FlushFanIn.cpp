@@ -8,14 +8,14 @@
 
 namespace kyt {
 
-FlushFanIn::FlushFanIn(ReportingdSessionClass& sessionClass, ResultReply completion,
+FlushFanIn::FlushFanIn(ReportingdSessionClass& sessionClass, uint32_t user, ResultReply completion,
                        int32_t outstandingBackends)
-    : class_(sessionClass), pending_(std::move(completion)), outstanding_(outstandingBackends) {}
+    : class_(sessionClass), user_(user), pending_(std::move(completion)), outstanding_(outstandingBackends) {}
 
 void FlushFanIn::backendFinished(const String& key, const String& name, Value result,
                                  std::optional<Error> error) {
   class_.platform().log.debug("internalFlushMessagesWithCompletion: %s", name.c_str());
-  if (!result.isNull()) class_.messageLog().writeToLogFile("[%@ -> flushMessages] %@", {key, result});
+  if (!result.isNull()) class_.messageLog().writeToLogFile(user_, "[%@ -> flushMessages] %@", {key, result});
   ResultReply completion;
   {
     MutexLock lock(class_.lock());

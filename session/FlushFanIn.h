@@ -18,11 +18,14 @@ namespace kyt {
 
 class FlushFanIn {
  public:
-  FlushFanIn(ReportingdSessionClass& sessionClass, ResultReply completion, int32_t outstandingBackends);
+  // `user`: whose session it is.
+  FlushFanIn(ReportingdSessionClass& sessionClass, uint32_t user, ResultReply completion,
+             int32_t outstandingBackends);
   void backendFinished(const String& key, const String& name, Value result, std::optional<Error> error);
 
  private:
   ReportingdSessionClass& class_;
+  const uint32_t user_;
   // Guarded by class_.lock(), one lock for the flushes of all sessions.
   ResultReply pending_ GUARDED_BY(class_.lock());
   int32_t outstanding_ GUARDED_BY(class_.lock());

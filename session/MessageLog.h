@@ -3,6 +3,7 @@
 // a call may block for file operations. A failure is the implementation's to log.
 #pragma once
 
+#include <cstdint>
 #include <initializer_list>
 
 #include "platform/Value.h"
@@ -12,8 +13,8 @@ namespace kyt {
 class MessageLog {
  public:
   virtual ~MessageLog() = default;
-  // One line: every "%@" of the format takes the next object's description.
-  virtual void writeToLogFile(const char* format, std::initializer_list<Value> objects) = 0;
+  // One line: every "%@" of the format takes the next object's description. `user`: whose client it is about.
+  virtual void writeToLogFile(uint32_t user, const char* format, std::initializer_list<Value> objects) = 0;
 };
 
 }  // namespace kyt

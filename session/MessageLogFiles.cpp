@@ -57,13 +57,17 @@ void MessageLogFiles::lineIsLost() {
   counters_.add(Reason::messageLogLineLost);
 }
 
-void MessageLogFiles::writeToLogFile(const char* format, std::initializer_list<Value> objects) {
+void MessageLogFiles::writeToLogFile(uint32_t user, const char* format,
+                                     std::initializer_list<Value> objects) {
   std::optional<File> file = currentFile();
   if (!file) file = newFile();
   if (!file) return lineIsLost();
   const std::string line =
       formatObjects("(%@) ", {Date{now()}}) + escapedLines(formatObjects(format, objects)) + "\n";
-  if (file->size + line.size() > Limits::maxMessageLogBytes && !beginNext(*file, line.size())) return;
+  if (!takeShare(user, file->path, line.size())) return;
+  if (file->size + line.size() > Limits::maxMessageLogBytes) {
+    if (!beginNext(*file, line.size()) || !takeShare(user, file->path, line.size())) return;
+  }
   if (const std::optional<Error> error = files_.append(file->path, line)) {
     log_.error("writeToLogFile: Error writing to log file %s: %s", file->path.c_str(),
                error->localizedDescription.c_str());
@@ -71,6 +75,26 @@ void MessageLogFiles::writeToLogFile(const char* format, std::initializer_list<V
     return lineIsLost();
   }
   log_.normal("writeToLogFile: Saved log message to %s", file->path.c_str());
+}
+
+bool MessageLogFiles::takeShare(uint32_t user, const std::string& path, size_t bytes) {
+  {
+    MutexLock lock(mutex_);
+    if (path != sharedFile_) {
+      sharedFile_ = path;
+      shares_.clear();
+    }
+    uint64_t& used = shares_[user];
+    if (bytes <= Limits::maxMessageLogBytesPerUser - used) {
+      used += bytes;
+      return true;
+    }
+  }
+  if (counters_.addAndMayLog(Reason::messageLogShareUsed, clock_.monotonic()))
+    log_.error(
+        "writeToLogFile: User %u has used his part of %s, his lines are left out until the next is begun",
+        user, path.c_str());
+  return false;
 }
 
 // A full file gives way to the next one; there is one a second at most.

@@ -1,15 +1,19 @@
 // The local message log as files: one line for each call, in a file that is current for a day after its
-// creation and then deleted by the next call, or by the one that finds it full. At most one file stays; every call lists the folder, so this is
-// for a low rate of lines. Files of other names in the folder are left alone.
+// creation and then deleted by the next call, or by the one that finds it full. At most one file stays; every call
+// lists the folder, so this is for a low rate of lines. Files of other names in the folder are left alone. Of each
+// user's clients no more than Limits::maxMessageLogBytesPerUser are written to a file, as far as this object knows;
+// what is more is dropped and counted.
 //
-// Takes no lock: each call opens, appends and closes within itself, and a line is appended in one piece, so
-// two calls at once do no more than start two files, of which the next call keeps the newer.
+// Takes no lock but for these sums: each call opens, appends and closes within itself, and a line is appended in one
+// piece, so two calls at once do no more than start two files, of which the next call keeps the newer.
 #pragma once
 
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/Value.h"
 #include "session/MessageLog.h"
 
@@ -27,7 +31,7 @@ class MessageLogFiles final : public MessageLog {
 
   // Line breaks within a line stay: they are those of texts that back ends laid out. Other control characters
   // and invalid UTF-8 are escaped. What a client sent as it is must have been escaped by the caller.
-  void writeToLogFile(const char* format, std::initializer_list<Value> objects) override;
+  void writeToLogFile(uint32_t user, const char* format, std::initializer_list<Value> objects) override;
 
  private:
   struct File {
@@ -40,6 +44,8 @@ class MessageLogFiles final : public MessageLog {
   [[nodiscard]] std::optional<File> newFile();
   // False: the line is lost, which has been counted.
   [[nodiscard]] bool beginNext(File& full, size_t wanted);
+  // False: the user has used his share of that file, which has been counted.
+  [[nodiscard]] bool takeShare(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
   void deleteFile(const File& file);
   void lineIsLost();
   [[nodiscard]] double now() const;
@@ -49,6 +55,9 @@ class MessageLogFiles final : public MessageLog {
   const Clock& clock_;
   Log& log_;
   Counters& counters_;
+  Mutex mutex_;
+  std::string sharedFile_ GUARDED_BY(mutex_);               // which one these are the users' parts of
+  std::map<uint32_t, uint64_t> shares_ GUARDED_BY(mutex_);  // bytes
 };
 
 }  // namespace kyt

@@ -47,12 +47,10 @@ void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, ui
         name.c_str(), category);
 }
 
-void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dictionary>& sessionInfo,
-                                                        const std::optional<Dictionary>& userInfo,
-                                                        const std::optional<Dictionary>& storebag,
-                                                        uint16_t category, uint16_t type,
-                                                        const std::optional<Dictionary>& payload,
-                                                        const std::shared_ptr<UserAccount>& account) {
+void ReportingdSessionClass::sendMessageWithSessionInfo(
+    uint32_t user, const std::optional<Dictionary>& sessionInfo, const std::optional<Dictionary>& userInfo,
+    const std::optional<Dictionary>& storebag, uint16_t category, uint16_t type,
+    const std::optional<Dictionary>& payload, const std::shared_ptr<UserAccount>& account) {
   Log& log = platform().log;
   const Value* sessionID = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoSessionID) : nullptr;
   log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %ld",
@@ -99,7 +97,8 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(const std::optional<Dict
     if (deviceIdentity().isInternalBuild())
       message.set("SerialNum", deviceIdentity().serialNumber().value_or("Unknown"));
     const Value answer = backend->sendMessage(std::move(message), timestamp, category, type, MessageFlag{0});
-    if (!answer.isNull()) messageLog_.writeToLogFile("[%@ -> sendMessageWithSessionInfo] %@", {key, answer});
+    if (!answer.isNull())
+      messageLog_.writeToLogFile(user, "[%@ -> sendMessageWithSessionInfo] %@", {key, answer});
   }
   for (const auto& [key, backend] : *backends) backend->cleanup();
 }

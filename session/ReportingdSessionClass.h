@@ -36,8 +36,9 @@ class ReportingdSessionClass {
   [[nodiscard]] Mutex& lock() RETURN_CAPABILITY(lock_) { return lock_; }
 
   // Sends one event without a configured session: builds back ends for it alone and discards them afterwards.
-  // Runs on the caller's queue. What it takes counts towards `account`; null: towards nobody's.
-  void sendMessageWithSessionInfo(const std::optional<Dictionary>& sessionInfo,
+  // Runs on the caller's queue. `user`: whose client sends it. What it takes counts towards `account`; null: towards
+  // nobody's.
+  void sendMessageWithSessionInfo(uint32_t user, const std::optional<Dictionary>& sessionInfo,
                                   const std::optional<Dictionary>& userInfo,
                                   const std::optional<Dictionary>& storebag, uint16_t category, uint16_t type,
                                   const std::optional<Dictionary>& payload,

@@ -19,8 +19,12 @@ namespace {
 // A client's text of any length must not fill the message log for all others: no URL of a file is longer.
 String shownURL(const String& url) {
   constexpr size_t kLongest = 3 * 4096;
-  if (url.size() <= kLongest) return escapedText(url);
-  return escapedText(url.view().substr(0, kLongest)) + " (cut)";
+  // Escaping makes no text shorter, so what is past this and a character more would be cut away.
+  const std::string shown = escapedText(url.view().substr(0, kLongest + 4));
+  if (shown.size() <= kLongest) return shown;
+  size_t end = kLongest;
+  while ((static_cast<unsigned char>(shown[end]) & 0xC0) == 0x80) --end;
+  return shown.substr(0, end) + " (cut)";
 }
 
 }  // namespace
@@ -37,8 +41,8 @@ void ReportingdSession::internalFlushMessagesWithCompletion(ResultReply completi
     if (completion) completion(nullptr, Error{kKYTReportingErrorDomain, -1, text});
     return;
   }
-  auto fanIn =
-      std::make_shared<FlushFanIn>(class_, std::move(completion), static_cast<int32_t>(_backends.size()));
+  auto fanIn = std::make_shared<FlushFanIn>(class_, peerUser_, std::move(completion),
+                                            static_cast<int32_t>(_backends.size()));
   for (const auto& [key, backend] : _backends) {
     // The operation's own result says nothing that the completion does not.
     static_cast<void>(backend->flushMessagesWithCompletion(
@@ -71,7 +75,7 @@ void ReportingdSession::uploadFileWithURL(const String& fileURL, const String& e
     log().debug("uploadFileWithURL: File upload successful for %s", shownPath);
   else
     log().error("uploadFileWithURL: File upload failed for %s", shownPath);
-  class_.messageLog().writeToLogFile("[uploadFileWithURL] Upload %@ for file %@",
+  class_.messageLog().writeToLogFile(peerUser_, "[uploadFileWithURL] Upload %@ for file %@",
                                      {success ? "succeeded" : "failed", shownURL(fileURL)});
   if (completionHandler) completionHandler(success);
 }

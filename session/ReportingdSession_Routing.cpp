@@ -147,7 +147,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
     Value result = backend->sendMessage(left == 0 ? std::exchange(envelope, {}) : envelope, timestamp,
                                         category, type, flag);
     if (result.isNull()) continue;
-    class_.messageLog().writeToLogFile("[%@ -> sendMessageWithDictionary] %@", {key, result});
+    class_.messageLog().writeToLogFile(peerUser_, "[%@ -> sendMessageWithDictionary] %@", {key, result});
     const String& name = backend->name();
     if (name == kKYTReportingBackendHTTPPost2 || name == kKYTReportingBackendHTTPPost ||
         (name == kKYTReportingBackendDashboard && answer.isNull()))
@@ -189,7 +189,8 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
     if (reply) reply("storebag not available");
     return;
   }
-  class_.sendMessageWithSessionInfo(sessionInfo, userInfo, storebag, category, type, payload, userAccount_);
+  class_.sendMessageWithSessionInfo(peerUser_, sessionInfo, userInfo, storebag, category, type, payload,
+                                    userAccount_);
   if (reply) reply("finished");
 }
 

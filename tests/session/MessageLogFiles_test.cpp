@@ -31,7 +31,9 @@ class MessageLogFilesTest : public testing::Test {
   void put(const std::string& file, double age, const std::string& bytes = "old\n") {
     files_.put(file, {bytes, Date{kNow - age}, true});
   }
-  void write(const char* text = "text") { log_.writeToLogFile("[%@ -> flushMessages] %@", {"qrs", text}); }
+  void write(const std::string& text = "text", uint32_t user = 1) {
+    log_.writeToLogFile(user, "[%@ -> flushMessages] %@", {"qrs", text});
+  }
   std::map<std::string, std::string> contents() const {
     std::map<std::string, std::string> bytes;
     for (const auto& [name, file] : files_.files()) bytes[name] = file.bytes;
@@ -263,6 +265,56 @@ TEST_F(MessageLogFilesTest, AFullFileStaysWhenTheNextCannotBeMade) {
   EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 1U);
 }
 
+// Of a line so long that four fill a user's share to the byte.
+std::string quarterOfAShare(size_t lineWithoutText) {
+  return std::string(Limits::maxMessageLogBytesPerUser / 4 - lineWithoutText, '.');
+}
+
+TEST_F(MessageLogFilesTest, AUserWhoHasUsedHisShareOfTheFileLeavesTheRestToOthers) {
+  const std::string much = quarterOfAShare(line("").size());
+  for (int i = 0; i < 4; ++i) write(much, 1);
+  const std::string file = logFile("1769860800");
+  EXPECT_EQ(contents().at(file).size(), Limits::maxMessageLogBytesPerUser);
+  write("left out", 1);
+  write("left out", 1);
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 2U);
+  EXPECT_EQ(
+      sink_.count(LogLevel::error, "writeToLogFile: User 1 has used his part of " + file + ", his lines"),
+      1U);
+  clock_.advance(std::chrono::minutes(1));
+  write("left out", 1);
+  EXPECT_EQ(sink_.count(LogLevel::error, "writeToLogFile: User 1 has used his part"), 2U);
+  clock_.setTimeOfDay({static_cast<int64_t>(kNow), 0});
+  write("another's", 2);
+  ASSERT_EQ(contents().size(), 1U) << "the file stays";
+  EXPECT_TRUE(contents().at(file).ends_with(line("another's")));
+  EXPECT_EQ(contents().at(file).size(), Limits::maxMessageLogBytesPerUser + line("another's").size());
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 0U);
+}
+
+TEST_F(MessageLogFilesTest, TheNextFileHasAShareForEachUserAgain) {
+  const std::string much = quarterOfAShare(line("").size());
+  for (int i = 0; i < 5; ++i) write(much, 1);
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 1U);
+  clock_.advance(std::chrono::hours(25));
+  write("again", 1);
+  EXPECT_EQ(contents().size(), 1U);
+  EXPECT_TRUE(contents().begin()->second.ends_with(" again\n"));
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 1U);
+}
+
+TEST_F(MessageLogFilesTest, AUserWhoHasUsedHisShareDoesNotBeginTheNextFile) {
+  for (uint32_t user = 1; user <= 4; ++user)
+    for (int i = 0; i < 4; ++i) write(quarterOfAShare(line("").size()), user);
+  EXPECT_EQ(contents().begin()->second.size(), Limits::maxMessageLogBytes);
+  clock_.advance(std::chrono::seconds(1));
+  write("left out", 1);
+  EXPECT_EQ(contents().begin()->second.size(), Limits::maxMessageLogBytes);
+  write("another's", 5);
+  EXPECT_EQ(contents().size(), 1U);
+  EXPECT_TRUE(contents().begin()->second.ends_with(" another's\n"));
+}
+
 TEST_F(MessageLogFilesTest, KeepsLineBreaksAndEscapesOtherControlCharacters) {
   write("{\n    \"a\" : 1\n}\x1b[2J\r\xff\xe2\x80\xae\x7f\t.");
   EXPECT_EQ(contents().at(logFile("1769860800")),
@@ -270,7 +322,7 @@ TEST_F(MessageLogFilesTest, KeepsLineBreaksAndEscapesOtherControlCharacters) {
 }
 
 TEST_F(MessageLogFilesTest, PrintsAMissingObjectAndContainers) {
-  log_.writeToLogFile("%@ %@ %@", {nullptr, Dictionary{{"k", Array{1, "v"}}}, true});
+  log_.writeToLogFile(1, "%@ %@ %@", {nullptr, Dictionary{{"k", Array{1, "v"}}}, true});
   EXPECT_EQ(contents().at(logFile("1769860800")), "(2026-01-31 12:00:00 +0000) (null) {\"k\":[1,\"v\"]} 1\n");
 }
 

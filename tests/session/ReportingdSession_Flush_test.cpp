@@ -88,10 +88,11 @@ TEST_F(SessionFlush, WithoutACompletionStillAsksTheBackEnds) {
 }
 
 TEST_F(SessionFlush, IsLoggedByTheBackEndsNameAndItsResultByTheKey) {
-  auto fanIn = std::make_shared<FlushFanIn>(class_, nullptr, 1);
+  auto fanIn = std::make_shared<FlushFanIn>(class_, 7, nullptr, 1);
   fanIn->backendFinished("key", "name", "result", std::nullopt);
   EXPECT_TRUE(logged(LogLevel::debug, "internalFlushMessagesWithCompletion: name"));
   EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[key -> flushMessages] result"});
+  EXPECT_EQ(messageLog_.users(), std::vector<uint32_t>{7});
 }
 
 TEST_F(SessionFlush, RacingAnswersCallTheCompletionOnce) {
@@ -99,7 +100,7 @@ TEST_F(SessionFlush, RacingAnswersCallTheCompletionOnce) {
     constexpr int kBackends = 4;
     std::atomic<int> answers{0};
     auto fanIn = std::make_shared<FlushFanIn>(
-        class_, [&answers](Value, std::optional<Error>) { ++answers; }, kBackends);
+        class_, 7, [&answers](Value, std::optional<Error>) { ++answers; }, kBackends);
     std::vector<std::jthread> threads;
     for (int i = 0; i < kBackends; ++i) {
       threads.emplace_back([fanIn, i, round] {
@@ -165,6 +166,22 @@ TEST_F(SessionUpload, AnAddressTooLongForAnyFileIsAskedOfNobodyAndIsCutInTheMess
   ASSERT_EQ(messageLog_.lines().size(), 3u);
   EXPECT_EQ(messageLog_.lines()[2],
             "[uploadFileWithURL] Upload failed for file file:///" + std::string(12280, 'x') + " (cut)");
+  EXPECT_EQ(messageLog_.users(), std::vector<uint32_t>(3, 1000)) << "whose connection it is";
+}
+
+TEST_F(SessionUpload, AnAddressIsCutInTheMessageLogOnceItIsEscapedAndNotWithinACharacter) {
+  configure({"uploadserver"});
+  const auto times = [](size_t count, const std::string& text) {
+    std::string all;
+    for (size_t i = 0; i < count; ++i) all += text;
+    return all;
+  };
+  EXPECT_FALSE(upload("file:///" + times(5000, "\x01")));
+  EXPECT_FALSE(upload("file:///a" + times(7000, "\u00e4")));
+  const std::string failed = "[uploadFileWithURL] Upload failed for file file:///";
+  ASSERT_EQ(messageLog_.lines().size(), 2u);
+  EXPECT_EQ(messageLog_.lines()[0], failed + times(3070, "\\x01") + " (cut)");
+  EXPECT_EQ(messageLog_.lines()[1], failed + "a" + times(6139, "\u00e4") + " (cut)");
 }
 
 TEST_F(SessionUpload, FailsWhenNobodyAccepts) {

@@ -327,8 +327,9 @@ TEST_F(SingleMessage, NewUserInformationReachesAConfiguredSessionsBackEnds) {
 }
 
 TEST_F(SingleMessage, TheClassRefusesMissingInformation) {
-  class_.sendMessageWithSessionInfo(std::nullopt, std::nullopt, table({"httppost"}), 1, 1, std::nullopt);
-  class_.sendMessageWithSessionInfo(sessionInfo(), std::nullopt, std::nullopt, 1, 1, std::nullopt);
+  class_.sendMessageWithSessionInfo(1000, std::nullopt, std::nullopt, table({"httppost"}), 1, 1,
+                                    std::nullopt);
+  class_.sendMessageWithSessionInfo(1000, sessionInfo(), std::nullopt, std::nullopt, 1, 1, std::nullopt);
   EXPECT_EQ(test_.sink.count(
                 LogLevel::error,
                 "RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters"),

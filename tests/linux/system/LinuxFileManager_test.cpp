@@ -86,7 +86,7 @@ TEST(MessageLogOnDisk, ExpiresByTheFilesOwnDates) {
   const std::string old = folder.write(nameWith("1"), "old\n");
   setModified(old, -86400 - 60);
   RealLog log(folder.path());
-  log.messages.writeToLogFile("%@", {"text"});
+  log.messages.writeToLogFile(1, "%@", {"text"});
   EXPECT_NE(::access(old.c_str(), F_OK), 0);
   EXPECT_EQ(entries(folder.path()), 1U);
   EXPECT_TRUE(log.sink.contains("Saved log message to " + folder.path() + "/kytreportingd_"));
@@ -97,7 +97,7 @@ TEST(MessageLogOnDisk, AppendsToTheNewerOfTwo) {
   setModified(folder.write(nameWith("1"), "newer\n"), -60);
   setModified(folder.write(nameWith("2"), "older\n"), -120);
   RealLog log(folder.path());
-  log.messages.writeToLogFile("%@", {"text"});
+  log.messages.writeToLogFile(1, "%@", {"text"});
   EXPECT_EQ(folder.read(nameWith("1")).substr(0, 7), "newer\n(");
   EXPECT_EQ(entries(folder.path()), 1U);
 }
@@ -105,7 +105,7 @@ TEST(MessageLogOnDisk, AppendsToTheNewerOfTwo) {
 TEST(MessageLogOnDisk, MakesItsFolder) {
   TemporaryFolder folder;
   RealLog log(folder / "var/mobile/Retired");
-  log.messages.writeToLogFile("%@", {"text"});
+  log.messages.writeToLogFile(1, "%@", {"text"});
   EXPECT_EQ(entries(folder / "var/mobile/Retired"), 1U);
 }
 
@@ -116,7 +116,7 @@ TEST(MessageLogOnDisk, AFolderThatMayNotBeListedIsWrittenToAllTheSame) {
   const std::string said = inChildProcess([&]() -> std::string {
     if (::geteuid() == 0 && ::setuid(kNobody) != 0) return "skip";
     RealLog log(folder.path());
-    log.messages.writeToLogFile("%@", {"text"});
+    log.messages.writeToLogFile(1, "%@", {"text"});
     if (!log.sink.contains(LogLevel::error,
                            "writeToLogFile: Error reading from log directory: Permission denied"))
       return "not said: unreadable";
@@ -134,7 +134,7 @@ TEST(MessageLogOnDisk, AFolderThatMayNotBeWrittenToLosesTheLine) {
   const std::string said = inChildProcess([&]() -> std::string {
     if (::geteuid() == 0 && ::setuid(kNobody) != 0) return "skip";
     RealLog log(folder.path());
-    log.messages.writeToLogFile("%@", {"text"});
+    log.messages.writeToLogFile(1, "%@", {"text"});
     if (log.counters.value(Reason::messageLogLineLost) != 1) return "not counted";
     return log.sink.contains(LogLevel::error, "writeToLogFile: Failed to create new kytreportingd log file")
                ? ""
@@ -153,14 +153,14 @@ TEST(MessageLogOnDisk, AFullDiskCostsTheFile) {
     if (!unshareMounts() || ::mount("tmpfs", folder.path().c_str(), "tmpfs", 0, "size=64k") != 0)
       return "skip";
     RealLog log(folder.path());
-    log.messages.writeToLogFile("%@", {"first"});
+    log.messages.writeToLogFile(1, "%@", {"first"});
     if (!log.sink.contains("Saved log message to")) return "a small line does not fit";
     log.sink.clear();
-    log.messages.writeToLogFile("%@", {std::string(100000, 'x')});
+    log.messages.writeToLogFile(1, "%@", {std::string(100000, 'x')});
     if (!log.sink.contains(LogLevel::error, ": No space left on device")) return "not said: full";
     if (!log.sink.contains("writeToLogFile: Deleted expired kytreportingd log file")) return "not deleted";
     if (entries(folder.path()) != 0) return "the file stays";
-    log.messages.writeToLogFile("%@", {"again"});
+    log.messages.writeToLogFile(1, "%@", {"again"});
     return entries(folder.path()) == 1 ? "" : "nothing is written after that";
   });
   if (said == "skip") GTEST_SKIP() << "cannot mount here";
