@@ -80,7 +80,7 @@ enum class Reason : uint8_t {
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
-  logLineDropped,       // nobody read standard error, and what may wait for that is full
+  logLineDropped,       // nobody read standard error or the journal, and what may wait for that is full
   messageLogLineLost,   // no file could be made or written, or it is full
   messageLogShareUsed,  // a line of a user who has filled his part of the message log's file
   valueNotPostable,     // a record's value removed because JSON cannot carry it

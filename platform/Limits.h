@@ -63,12 +63,12 @@ struct Limits {
   static constexpr unsigned turnCalls = 256;        // a connection hands its worker back after so many calls
   static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
   static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them
-  static constexpr size_t maxQueuedLogBytes = 1u << 20;  // lines that wait for whoever reads standard error
+  static constexpr size_t maxQueuedLogBytes = 1u << 20;  // lines that wait for whoever reads the log
   // Of one text, above the debug level, for the clients of one user: the journal's own limit would hit everybody.
   static constexpr unsigned maxLogLinesPerSecond = 200;
   static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk
-  static constexpr uint64_t maxMessageLogBytesPerUser =
-      maxMessageLogBytes / 4;                           // … nor push out others' lines
+  // … nor those of one user push out others' lines.
+  static constexpr uint64_t maxMessageLogBytesPerUser = maxMessageLogBytes / 4;
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
 };
 

@@ -40,13 +40,20 @@ struct LineWriter::State {
     return ::poll(&writable, 1, 0) >
            0;  // also where it is closed or no reader is left: then writing fails at once
   }
-  // What is left of the text: it stops where writing would wait. What fails is lost, since there is nowhere to say so.
-  [[nodiscard]] std::string_view writeWhatHasRoom(std::string_view text) const {
+  // What is left of the line: it stops where writing would wait. What fails is lost, unless somebody else can take it.
+  [[nodiscard]] std::string_view writeWhatHasRoom(const std::string& line) const REQUIRES(mutex) {
+    std::string_view text = line;
+    bool wasRefused = false;
     while (!text.empty() && hasRoom()) {
-      const ssize_t count = ::write(descriptor, text.data(), std::min<size_t>(text.size(), PIPE_BUF));
+      const size_t most = options.datagrams ? text.size() : PIPE_BUF;
+      const ssize_t count = ::write(descriptor, text.data(), std::min(text.size(), most));
       if (count < 0 && errno == EINTR) continue;
       if (count < 0 && errno == EAGAIN) return text;
-      if (count < 0) return {};
+      if (count < 0) {
+        const bool lastTime = std::exchange(wasRefused, true);
+        if (!options.refused || !options.refused(line, lastTime) || lastTime) return {};
+        continue;
+      }
       text.remove_prefix(static_cast<size_t>(count));
     }
     return text;
@@ -128,7 +135,8 @@ LineWriter::~LineWriter() {
   if (!state_->draining) state_->flush();
   while (state_->draining && state_->drained.waitUntil(state_->mutex, end)) {
   }
-  state_->options.dropped = nullptr;  // what it counts in may end now
+  state_->options.dropped = nullptr;  // what they use may end now
+  state_->options.refused = nullptr;
 }
 
 void LineWriter::allowThread() {

@@ -1,4 +1,4 @@
-// Lines for a descriptor whose reader may be slow, or read no more without closing: whoever writes never waits. A line
+// Lines for a descriptor whose reader (of a pipe, of a socket of datagrams) may be slow, or read no more without closing: whoever writes never waits. A line
 // is written at once where there is room for it; otherwise it waits in a bounded queue, which a thread ("kyt-log")
 // writes out while somebody reads. What finds no room there is dropped and counted, and a line tells how many when there
 // is room again. Any thread.
@@ -18,12 +18,20 @@ struct LineWriterOptions {
   std::function<void()> dropped;
   // The line that tells how many were, its end included.
   std::function<std::string(unsigned long long)> lineAboutDropped;
+  // Each line is one message of a socket of datagrams, which must not block.
+  bool datagrams = false;
+  // Told of a line that cannot be written, and not because of room, with errno as it was. True: it is tried once more,
+  // and told of as the last time when that fails too. While it runs no other line is written. Null: such a line is lost.
+  std::function<bool(const std::string&, bool lastTime)> refused;
+  // Kept as long as the descriptor may be used, by the thread too.
+  std::shared_ptr<const void> keepsDescriptor;
 };
 
 class LineWriter {
  public:
-  LineWriter(int descriptor, LineWriterOptions options);  // the descriptor stays the caller's, and open
-  ~LineWriter();                                          // waits for what is queued, a second at most
+  LineWriter(int descriptor,
+             LineWriterOptions options);  // the descriptor stays the caller's, and open, but see above
+  ~LineWriter();                          // waits for what is queued, a second at most
   LineWriter(const LineWriter&) = delete;
   LineWriter& operator=(const LineWriter&) = delete;
 

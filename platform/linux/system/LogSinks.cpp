@@ -1,11 +1,15 @@
 #include "platform/linux/system/LogSinks.h"
 
+#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/uio.h>
+#include <sys/un.h>
+
+#include <cerrno>
+#include <cstring>
+#include <utility>
 
 #include "platform/TextEscape.h"
 #include "platform/linux/system/Files.h"
-#include "platform/linux/system/SystemdLibrary.h"
 
 namespace kyt {
 namespace {
@@ -33,10 +37,34 @@ std::string textOfLine(LogLevel level, std::string_view line) {
   return text;
 }
 
-constexpr size_t kLongestOperation = 128;
+std::string aboutDropped(unsigned long long count) {
+  return "log: " + std::to_string(count) + " lines were dropped, since nobody read them";
+}
 
-iovec field(const std::string& text) {
-  return {const_cast<char*>(text.data()), text.size()};
+constexpr const char* kJournal = "/run/systemd/journal/socket";
+constexpr size_t kLongestOperation = 128;
+constexpr std::string_view kMessage = "MESSAGE=";
+constexpr std::string_view kPriority = "PRIORITY=";
+
+// By the journal's own protocol: a field a line, since no field has a line break once it is escaped. libsystemd would
+// wait while the journal takes nothing.
+std::string entryOfLine(const std::string& identifier, LogLevel level, std::string_view line) {
+  std::string entry(kMessage);
+  appendEscaped(entry, line);
+  entry.append("\n").append(kPriority).append(1, priority(level));
+  entry.append("\nSYSLOG_IDENTIFIER=").append(identifier).append("\nKYT_OPERATION=");
+  const size_t colon = line.substr(0, kLongestOperation).find(':');
+  if (colon != std::string_view::npos) appendEscaped(entry, line.substr(0, colon));
+  entry += '\n';
+  return entry;
+}
+
+// Also one that was started anew.
+bool connectToJournal(int socket) {
+  sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  std::strcpy(address.sun_path, kJournal);
+  return ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 
 }  // namespace
@@ -48,10 +76,9 @@ void StderrSink::write(LogLevel level, std::string_view line) {
 PatientStderrSink::PatientStderrSink(Counters& counters, int fd, size_t maxQueuedBytes)
     : lines_(fd, LineWriterOptions{maxQueuedBytes, [&counters] { counters.add(Reason::logLineDropped); },
                                    [](unsigned long long count) {
-                                     return textOfLine(LogLevel::error,
-                                                       "log: " + std::to_string(count) +
-                                                           " lines were dropped, since nobody read them");
-                                   }}) {}
+                                     return textOfLine(LogLevel::error, aboutDropped(count));
+                                   },
+                                   false, nullptr, nullptr}) {}
 
 void PatientStderrSink::write(LogLevel level, std::string_view line) {
   lines_.write(textOfLine(level, line));
@@ -59,34 +86,57 @@ void PatientStderrSink::write(LogLevel level, std::string_view line) {
 
 bool JournalSink::isAvailable() {
   struct stat status = {};
-  return ::stat("/run/systemd/journal/socket", &status) == 0 && S_ISSOCK(status.st_mode);
+  return ::stat(kJournal, &status) == 0 && S_ISSOCK(status.st_mode);
 }
 
-std::unique_ptr<JournalSink> JournalSink::open(Counters& counters, std::string identifier) {
-  const auto loaded = SystemdLibrary::load();
-  if (const auto* problem = std::get_if<std::string>(&loaded)) {
-    StderrSink().write(LogLevel::error, "JournalSink(open): no journal: " + *problem);
+std::unique_ptr<JournalSink> JournalSink::open(Counters& counters, std::string identifier,
+                                               size_t maxQueuedBytes) {
+  const auto socket =
+      std::make_shared<FileHandle>(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (!*socket || !connectToJournal(socket->get())) {
+    StderrSink().write(LogLevel::error, "JournalSink(open): no journal: " + errorText(errno));
     return nullptr;
   }
-  // The function that takes no place in the source: it would be the same for every line.
-  Send* const send = std::get<SystemdLibrary>(loaded).journalSend;
-  return std::unique_ptr<JournalSink>(new JournalSink(send, counters, std::move(identifier)));
+  return std::unique_ptr<JournalSink>(
+      new JournalSink(socket->get(), socket, counters, std::move(identifier), maxQueuedBytes));
+}
+
+JournalSink::JournalSink(int socket, std::shared_ptr<const void> keepsSocket, Counters& counters,
+                         std::string identifier, size_t maxQueuedBytes)
+    : socket_(socket),
+      identifier_(std::move(identifier)),
+      fallback_(counters),
+      entries_(
+          socket,
+          LineWriterOptions{
+              maxQueuedBytes, [&counters] { counters.add(Reason::logLineDropped); },
+              [name = identifier_](unsigned long long count) {
+                return entryOfLine(name, LogLevel::error, aboutDropped(count));
+              },
+              true, [this](const std::string& entry, bool lastTime) { return connectAgain(entry, lastTime); },
+              std::move(keepsSocket)}) {}
+
+bool JournalSink::connectAgain(const std::string& entry, bool lastTime) {
+  if (!lastTime && connectToJournal(socket_)) return true;
+  const std::string_view text = std::string_view(entry).substr(kMessage.size());
+  const size_t end = text.find('\n');
+  const char level = text.substr(end + 1 + kPriority.size()).front();
+  const LogLevel levels[] = {LogLevel::debug, LogLevel::normal, LogLevel::error};
+  for (const LogLevel each : levels)
+    if (priority(each) == level) fallback_.write(each, text.substr(0, end));
+  return false;
+}
+
+void JournalSink::allowThreads() {
+  fallback_.allowThreads();
+  entries_.allowThread();
 }
 
 void JournalSink::write(LogLevel level, std::string_view line) {
-  std::string message = "MESSAGE=";
-  appendEscaped(message, line);
-  const std::string priorityField = std::string("PRIORITY=") + priority(level);
-  const std::string identifier = "SYSLOG_IDENTIFIER=" + identifier_;
-  std::string operation = "KYT_OPERATION=";
-  const size_t colon = line.substr(0, kLongestOperation).find(':');
-  if (colon != std::string_view::npos) appendEscaped(operation, line.substr(0, colon));
-  const iovec fields[] = {field(message), field(priorityField), field(identifier), field(operation)};
-  if (send_(fields, 4) < 0) fallback_.write(level, line);
+  entries_.write(entryOfLine(identifier_, level, line));
 }
 
 std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters) {
-  // Without its socket libsystemd would report success and drop every line.
   if (target != LogTarget::standardError && JournalSink::isAvailable()) {
     if (auto journal = JournalSink::open(counters)) return journal;
   }

@@ -13,8 +13,6 @@
 #include "platform/Settings.h"
 #include "platform/linux/base/LineWriter.h"
 
-struct iovec;
-
 namespace kyt {
 
 // A line each, in one write: "<7>" in front for debug, "<6>" for default, "<3>" for error.
@@ -41,24 +39,29 @@ class PatientStderrSink final : public LogSink {
 };
 
 // Entries with MESSAGE, PRIORITY (7, 6, 3), SYSLOG_IDENTIFIER and KYT_OPERATION (what stands before the first
-// colon). What the journal does not take goes to standard error.
+// colon). Nobody waits for a journal that is slow or stopped: entries wait in a queue as above. What the journal does not
+// take, since it is gone, goes to standard error.
 class JournalSink final : public LogSink {
  public:
-  // None where libsystemd is missing; why is written to standard error.
+  // None where the journal's socket cannot be connected to; why is written to standard error.
   [[nodiscard]] static std::unique_ptr<JournalSink> open(Counters& counters,
-                                                         std::string identifier = "kytreportingd");
+                                                         std::string identifier = "kytreportingd",
+                                                         size_t maxQueuedBytes = Limits::maxQueuedLogBytes);
   void write(LogLevel level, std::string_view line) override;
-  void allowThreads() override { fallback_.allowThreads(); }
+  void allowThreads() override;
   // Whether the journal's socket is there.
   [[nodiscard]] static bool isAvailable();
 
  private:
-  using Send = int(const iovec*, int);
-  JournalSink(Send* send, Counters& counters, std::string identifier)
-      : send_(send), identifier_(std::move(identifier)), fallback_(counters) {}
-  Send* const send_;  // sd_journal_sendv
+  JournalSink(int socket, std::shared_ptr<const void> keepsSocket, Counters& counters, std::string identifier,
+              size_t maxQueuedBytes);
+  // Whether there is a journal to try again with; otherwise the entry has gone to standard error.
+  [[nodiscard]] bool connectAgain(const std::string& entry, bool lastTime);
+
+  const int socket_;
   const std::string identifier_;
   PatientStderrSink fallback_;
+  LineWriter entries_;
 };
 
 // The journal when its socket is there and standard error was not asked for.

@@ -4,8 +4,11 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <csignal>
 #include <filesystem>
+#include <functional>
 #include <iterator>
+#include <memory>
 #include <thread>
 #include <vector>
 
@@ -183,6 +186,93 @@ TEST(JournalSink, SendsTheFieldsOfEachLine) {
       "KYT_OPERATION=Class(operation)\n--\n"
       "MESSAGE=Class(operation): a\\nPRIORITY=0\\xff\nPRIORITY=3\nSYSLOG_IDENTIFIER=kytreportingd\n"
       "KYT_OPERATION=Class(operation)\n--\n");
+}
+
+// What `work` says in a process that finds a journal of its own; whoever waits for that is ended after a while.
+std::string withAJournal(const std::function<std::string(std::unique_ptr<TestJournal>&)>& work) {
+  return inChildProcess([&]() -> std::string {
+    std::signal(SIGALRM, SIG_DFL);
+    ::alarm(60);
+    if (!TestJournal::hideRun()) return "no mount namespace";
+    auto journal = std::make_unique<TestJournal>();
+    return journal->isOpen() ? work(journal) : "bind";
+  });
+}
+
+std::string messageOf(const std::string& entry) {
+  return entry.substr(0, entry.find('\n'));
+}
+
+TEST(JournalSink, NobodyWaitsForAJournalThatIsStopped) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
+  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>& journal) -> std::string {
+              constexpr uint64_t kLines = 5000;
+              Counters counters;
+              const auto sink = JournalSink::open(counters, "k", 1000);
+              sink->allowThreads();
+              for (uint64_t i = 0; i < kLines; ++i)
+                sink->write(LogLevel::normal, "line " + std::to_string(i));
+              const uint64_t dropped = counters.value(Reason::logLineDropped);
+              if (dropped == 0) return "all had room";
+              for (uint64_t i = 0; i < kLines - dropped; ++i) {
+                const std::string message = messageOf(journal->nextEntry());
+                if (message != "MESSAGE=line " + std::to_string(i)) return std::to_string(i) + ": " + message;
+              }
+              const std::string told = messageOf(journal->nextEntry());
+              return told == "MESSAGE=log: " + std::to_string(dropped) +
+                                 " lines were dropped, since nobody read them"
+                         ? ""
+                         : told;
+            }),
+            "");
+}
+
+TEST(JournalSink, EndsThoughTheJournalIsStopped) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
+  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>&) -> std::string {
+              Counters counters;
+              const auto sink = JournalSink::open(counters);
+              sink->allowThreads();
+              for (int i = 0; i < 5000; ++i) sink->write(LogLevel::normal, "line");
+              return "";
+            }),
+            "");
+}
+
+TEST(JournalSink, WritesToStandardErrorWhatIsTooLargeForTheJournalsSocket) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
+  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>& journal) -> std::string {
+              const Pipe standardError;
+              if (::dup2(standardError.out.get(), 2) != 2) return "dup2";
+              Counters counters;
+              const auto sink = JournalSink::open(counters);
+              sink->write(LogLevel::error, std::string(1000000, 'x'));
+              sink->write(LogLevel::normal, "next");
+              return standardError.next().substr(0, 5) + messageOf(journal->nextEntry());
+            }),
+            "<3>xxMESSAGE=next");
+}
+
+TEST(JournalSink, FindsAJournalThatWasStartedAnewAndMeanwhileWritesToStandardError) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
+  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>& journal) -> std::string {
+              const Pipe standardError;
+              if (::dup2(standardError.out.get(), 2) != 2) return "dup2";
+              Counters counters;
+              const auto sink = JournalSink::open(counters);
+              sink->write(LogLevel::normal, "first");
+              std::string all = messageOf(journal->nextEntry()) + ", ";
+              journal = nullptr;
+              sink->write(LogLevel::error, "meanwhile\n");
+              sink->write(LogLevel::debug, "still");
+              all += standardError.next();
+              all += standardError.next();
+              if (::unlink("/run/systemd/journal/socket") != 0) return "unlink";
+              journal = std::make_unique<TestJournal>();
+              sink->write(LogLevel::normal, "second");
+              return all + messageOf(journal->nextEntry());
+            }),
+            "MESSAGE=first, <3>meanwhile\\n\n<7>still\nMESSAGE=second");
 }
 
 }  // namespace
