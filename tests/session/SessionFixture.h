@@ -38,8 +38,9 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   [[nodiscard]] bool isLocked() {
     bool free = false;
     std::thread([&] {
-      free = monitor_.tryLock();
-      if (free) monitor_.unlock();
+      if (!monitor_.tryLock()) return;
+      monitor_.unlock();
+      free = true;
     }).join();
     return !free;
   }
