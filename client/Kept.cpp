@@ -19,7 +19,8 @@ void Kept::takeOver(const Command& sent) {
       configured = true;
       return;
     case Command::Kind::fetchStates:
-      if (sent.dictionary) userInfo = sent.dictionary;
+      // None leaves what was promised, and takes away what was not.
+      if (sent.dictionary || !promisesUserInfo()) userInfo = sent.dictionary;
       return;
     case Command::Kind::updateSharedData:
       // A null is left out on the way to the daemon, where the former value stays.
@@ -41,6 +42,11 @@ void Kept::takeOver(const Command& sent) {
   }
 }
 
+bool Kept::promisesUserInfo() const {
+  const Value* required = sessionInfo.find(kKYTReportingSessionInfoRequireUserInfo);
+  return required != nullptr && required->boolValue();
+}
+
 std::string Kept::whyNoStorebag() const {
   const Value* type = sessionInfo.find(kKYTReportingSessionInfoClientType);
   if (type == nullptr) return "the session's information has no ClientType, so there is no storebag for it";
@@ -52,8 +58,7 @@ std::string Kept::whyNoStorebag() const {
 }
 
 std::string Kept::whyNotLive() const {
-  const Value* required = sessionInfo.find(kKYTReportingSessionInfoRequireUserInfo);
-  const bool promised = required != nullptr && required->boolValue();
+  const bool promised = promisesUserInfo();
   if (promised && (!userInfo || userInfo->empty()))
     return "RequireUserInfo is set, and the session has no user information";
   return "no entry of the storebag is switched on for ClientName " +

@@ -21,6 +21,7 @@ struct Kept {
   int32_t digestAlgorithm = 0;
 
   void takeOver(const Command& sent);
+  [[nodiscard]] bool promisesUserInfo() const;
 
   // Why a session like this has no storebag, or no live back end: as far as it can be known here.
   [[nodiscard]] std::string whyNoStorebag() const;

@@ -124,6 +124,21 @@ TEST_F(ClientReplay, SendsUserInformationByItselfWhenItDoesNotFitBesideTheRest) 
             (std::vector<std::string>{"SetSessionInfo 42", "FetchStates n", "StartConfig", "Flush"}));
 }
 
+// As the daemon takes it: what was promised stays, what was not is gone.
+TEST_F(ClientReplay, SendsNoUserInformationThatTheProgramTookBack) {
+  ASSERT_TRUE(daemon_.start());
+  for (const bool promised : {false, true}) {
+    KYTReporting::Options with = options();
+    with.sessionInfo = SessionInfo{.sessionID = 42, .clientType = 7, .requireUserInfo = promised};
+    with.userInfo = Dictionary{{"ClientName", "n"}};
+    const auto session = KYTReporting::open(std::move(with));
+    session->fetchStates(std::nullopt);
+    ASSERT_TRUE(allTaken(*session));
+    EXPECT_EQ(toldAgain(*session),
+              (std::vector<std::string>{promised ? "SetSessionInfo 42 user" : "SetSessionInfo 42", "Flush"}));
+  }
+}
+
 TEST_F(ClientReplay, SendsNothingForASessionThatCannotSayWhoItIs) {
   ASSERT_TRUE(daemon_.start());
   KYTReporting::Options huge = options();

@@ -170,7 +170,7 @@ class KYT_EXPORT KYTReporting {
   // Asks the daemon to configure the session from its storebag. The completion gets the names of the live
   // back ends; none (and no error) without a storebag, or with one that names no back end. May be empty.
   void startConfiguration(StatesCompletion completion = nullptr);
-  // New user information; none: as it was.
+  // New user information; none: as it was where RequireUserInfo is set, else none from now on.
   void fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion = nullptr);
   void fetchDisplayURL(TextCompletion completion);
 

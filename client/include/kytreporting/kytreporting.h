@@ -126,7 +126,7 @@ KYT_API kyt_state kyt_session_state(const kyt_session* session);
 KYT_API void kyt_session_state_reason(const kyt_session* session, char* reason, size_t size);
 
 KYT_API void kyt_session_configure(kyt_session* session, kyt_states_callback callback, void* context);
-/* New user information; null: as it was. */
+/* New user information; null: as it was where RequireUserInfo is set, else none from now on. */
 KYT_API void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary* user_info,
                                       kyt_states_callback callback, void* context);
 /* Whether the message was taken. Category and type are 0 to 65535; other numbers are refused. `payload` may be null and
