@@ -124,6 +124,11 @@ bool URLNetwork::startThread() {
   if (epoll_ < 0) epoll_ = epoll_create1(EPOLL_CLOEXEC);
   if (wake_ < 0) wake_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   if (epoll_ < 0 || wake_ < 0) return false;
+  epoll_event wake{};
+  wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read
+  wake.data.u64 = kWake;
+  // Without it the thread would not hear of further requests.
+  if (epoll_ctl(epoll_, EPOLL_CTL_ADD, wake_, &wake) != 0 && errno != EEXIST) return false;
   try {
     thread_ = std::thread([this] { run(); });
     running_ = true;
@@ -192,10 +197,6 @@ URLFigures URLNetwork::figures() const {
 void URLNetwork::run() {
   beginServiceThread("kyt-network");
   workers_ = std::make_unique<WorkerPool>(completionWorkers());
-  epoll_event wake{};
-  wake.events = EPOLLIN | EPOLLET;  // an edge for each write: it need not be read
-  wake.data.u64 = kWake;
-  epoll_ctl(epoll_, EPOLL_CTL_ADD, wake_, &wake);
   sockets_.setEpoll(epoll_);
   now_ = currentTime();
   for (;;) {

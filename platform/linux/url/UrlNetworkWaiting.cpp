@@ -119,7 +119,8 @@ void URLNetwork::listenForRoutes() {
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.u64 = kRoutes;
-  epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event);
+  // Otherwise again with the next request that waits; the slow timer runs anyway.
+  if (epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event) != 0) routeEvents_.unsubscribe();
 }
 
 void URLNetwork::waitingTimer() {
