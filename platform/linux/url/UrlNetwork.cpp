@@ -202,10 +202,11 @@ void URLNetwork::run() {
   for (;;) {
     takeCommands();
     deadlines_.fireUntil(now_);
+    const bool ends = cancelled_.load();  // before what is there is cancelled, or some of it might be left
     cancelWhatIsUnwanted();
     activateNextInLine();
     endRetiredPools();
-    if (cancelled_.load()) {
+    if (ends) {
       MutexLock lock(mutex_);
       if (stopping_ && commands_.empty()) break;
     }
