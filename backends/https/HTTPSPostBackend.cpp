@@ -149,13 +149,14 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
   Array records;
   records.append(Value(std::move(record)));
   Value text;
-  std::optional<std::string> json = createMessageForPostAndLogging(std::move(records), &text);
+  size_t events = 0;
+  std::optional<std::string> json = createMessageForPostAndLogging(std::move(records), &text, &events);
   if (!json) return {};
   if (!flushed.isNull()) {
     text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
     immutable_ = true;
   }
-  postJSONMessage(std::move(*json), flag, method, respCode, nullptr);
+  postJSONMessage(std::move(*json), flag, method, respCode, nullptr, events);
   return text;
 }
 

@@ -67,9 +67,10 @@ class HTTPSPostBackend : public KYTReportingBackend {
   // The text of a flush that the record's method forced, or nothing.
   Value batchEvent(Dictionary record);
   // The request body. `prettyJSONString`, when given, receives the pretty text where that may be shown, else
-  // null.
+  // null; `events`, when given, how many of the records are in the body: all, or none without a client ID.
   [[nodiscard]] std::optional<std::string> createMessageForPostAndLogging(Array records,
-                                                                          Value* prettyJSONString);
+                                                                          Value* prettyJSONString,
+                                                                          size_t* events = nullptr);
   // The completion gets (nothing, error or nothing); it is never called without a connectivity delegate.
   // `events` is how many are lost with the message.
   void postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,

@@ -151,8 +151,8 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   Array records = recordsToPost(std::move(batch), bytes);
   Value pretty;
   std::optional<std::string> json;
-  const size_t events = records.size();
-  if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty);
+  size_t events = 0;
+  if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty, &events);
   giveBackToUser(bytes);  // the request counts by itself
   if (!json) {
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));

@@ -126,7 +126,8 @@ bool HTTPSPostBackend::mayShowPrettyText() const {
 }
 
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array records,
-                                                                            Value* prettyJSONString) {
+                                                                            Value* prettyJSONString,
+                                                                            size_t* events) {
   Value* values = records.mutableBegin();
   for (size_t i = 0; i < records.size(); ++i) removeUnpostable(*values[i].mutableDictionary());
   Dictionary entries;
@@ -134,7 +135,9 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
   entries.append("postTime", finiteOrMinusOne(platform_.clock.timeOfDay().asSeconds()));
   // Deliberately a list that ends at the first missing object: servers know that events never come without
   // a client ID, and that such a message carries its time alone.
-  if (const std::optional<String> client = clientID()) {
+  const std::optional<String> client = clientID();
+  if (events != nullptr) *events = client ? records.size() : 0;
+  if (client) {
     entries.append("clientId", *client);
     entries.append("events", Value(std::move(records)));
   } else {

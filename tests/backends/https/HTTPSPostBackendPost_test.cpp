@@ -502,6 +502,22 @@ TEST_F(LostPosts, CountEventsThatLeaveTheirMessageForWantOfAClientID) {
   backend().setUdid(nullptr);
   flushTwo();
   EXPECT_EQ(dropped(Reason::postWithoutClientID), 2u);
+  poster_->answer(0, 404);
+  EXPECT_EQ(dropped(Reason::requestRefused), 1u);
+  EXPECT_EQ(dropped(Reason::postRefused), 0u) << "they counted already";
+}
+
+TEST_F(LostPosts, CountNoEventThatLeftItsMessageTwice) {
+  entry_.set("extras_on_internal", 1);
+  entry_.set("expedite", 1);
+  backend().setIsInternal(true);
+  backend().setUdid(nullptr);
+  decided();
+  send(5);
+  EXPECT_EQ(dropped(Reason::postWithoutClientID), 1u);
+  poster_->fail(0, Error{kKYTURLErrorDomain, 7, "no connection"});
+  EXPECT_EQ(dropped(Reason::requestFailed), 1u);
+  EXPECT_EQ(dropped(Reason::postFailed), 0u);
 }
 
 TEST_F(LostPosts, AreToldOnceAMinuteWithStatusAndAddress) {
