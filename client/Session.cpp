@@ -149,7 +149,7 @@ bool Session::finishAndWait(milliseconds timeout) {
   auto command = std::make_unique<Command>(Command::Kind::finish);
   command->successCompletion = [this](bool success, std::optional<Error>) {
     MutexLock lock(stateMutex_);
-    finished_ = success;
+    finished_ = finished_ || success;  // a second goodbye that fails takes nothing back
     goodbyeOver_ = true;
     stateChanged_.notify_all();
   };

@@ -32,13 +32,13 @@ class RecordingSession final : public ClientSessionInterface {
   }
   void fetchDisplayURL(StringReply reply) override { reply("https://display"); }
   void sendMessageWithDictionary(Dictionary message, ObjectReply reply) override {
-    record_->add("Send " + numberAt(message, "Category") + " " + numberAt(message, "Type") + " " +
-                 numberAt(message, "Flag"));
-    {
+    {  // before the call is seen by whoever waits for it
       const std::lock_guard lock(record_->mutex);
       if (const Value* payload = message.find("Payload"); payload != nullptr && payload->isDictionary())
         record_->lastPayload = *payload->dictionary();
     }
+    record_->add("Send " + numberAt(message, "Category") + " " + numberAt(message, "Type") + " " +
+                 numberAt(message, "Flag"));
     if (reply) reply("posted");
   }
   void flushMessagesWithCompletion(ResultReply completion) override {

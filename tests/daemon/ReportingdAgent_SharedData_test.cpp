@@ -121,7 +121,8 @@ TEST_F(AgentHealth, TellsWhatChangedSinceTheLastReport) {
   configure(a);
   const auto backend = factory_.latest("httppost");
   const auto batchSize = [&](const char* code) {
-    const Value* size = report(asks).find(std::string("BatchSize_") + code);
+    const Dictionary payload = report(asks);
+    const Value* size = payload.find(std::string("BatchSize_") + code);
     return size != nullptr ? size->longLongValue() : -1;
   };
   EXPECT_EQ(batchSize("QH"), 0);

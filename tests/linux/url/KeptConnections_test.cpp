@@ -56,9 +56,9 @@ class KeptConnections : public CurlURLSessionFixture, public testing::WithParamI
   }
 
   TestCertificateAuthority authority_;
-  std::unique_ptr<TestHTTPServer> server_;
   std::mutex mutex_;
   std::map<size_t, int> requestsOf_;
+  std::unique_ptr<TestHTTPServer> server_;  // ends before what its threads use
 };
 
 INSTANTIATE_TEST_SUITE_P(PlainAndTLS, KeptConnections, testing::Bool(),
