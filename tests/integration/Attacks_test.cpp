@@ -34,7 +34,7 @@ class Attacker {
     if (pid_ == 0) {
       if (::setgroups(0, nullptr) != 0 || ::setgid(kNobody) != 0 || ::setuid(kNobody) != 0) ::_exit(126);
       work(socket);
-      static_cast<void>(::write(ends[1], "x", 1));
+      if (::write(ends[1], "x", 1) != 1) ::_exit(1);
       for (;;) ::pause();
     }
     ::close(ends[1]);
