@@ -87,8 +87,10 @@ bool LinuxConfinement::limitsAddressSpace() {
 }
 
 uint64_t LinuxConfinement::descriptorLimit() {
+  // Where the system does not tell: what it gives a process that asks for nothing. With none no user would have a share.
+  constexpr uint64_t kUsual = 1024;
   rlimit now = {};
-  return ::getrlimit(RLIMIT_NOFILE, &now) == 0 ? now.rlim_cur : 0;
+  return ::getrlimit(RLIMIT_NOFILE, &now) == 0 ? now.rlim_cur : kUsual;
 }
 
 std::variant<ConfinementProfile, TomlError> LinuxConfinement::read(std::string_view profileName) const {
