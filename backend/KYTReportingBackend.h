@@ -21,9 +21,9 @@
 #include "backend/SessionIDPath.h"
 #include "platform/Clock.h"
 #include "platform/Error.h"
+#include "platform/FileExtension.h"
 #include "platform/Function.h"
 #include "platform/Value.h"
-#include "platform/ipc/ClientSessionInterface.h"
 
 namespace kyt {
 

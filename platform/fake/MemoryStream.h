@@ -10,7 +10,7 @@
 #include <utility>
 
 #include "platform/Reactor.h"
-#include "platform/ipc/Stream.h"
+#include "platform/Stream.h"
 
 namespace kyt {
 

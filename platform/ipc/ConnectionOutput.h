@@ -15,9 +15,9 @@
 
 #include "platform/Function.h"
 #include "platform/Mutex.h"
+#include "platform/Stream.h"
 #include "platform/UserBudget.h"
 #include "platform/ipc/MessageWriter.h"
-#include "platform/ipc/Stream.h"
 
 namespace kyt {
 

@@ -12,10 +12,10 @@
 
 #include "platform/Mutex.h"
 #include "platform/Reactor.h"
+#include "platform/Stream.h"
 #include "platform/Timer.h"
 #include "platform/ipc/Listener.h"
 #include "platform/ipc/ServerContext.h"
-#include "platform/ipc/Stream.h"
 
 namespace kyt {
 

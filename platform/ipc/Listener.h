@@ -1,5 +1,5 @@
 // The listener of the named IPC service and its connections, as the agent sees them. The real ones are
-// platform/ipc/DBusServer.h over Unix sockets; tests use platform/fake/FakeListener.h.
+// platform/ipc/DBusServer.h over Unix sockets; tests use platform/ipc/fake/FakeListener.h.
 #pragma once
 
 #include <cstdint>

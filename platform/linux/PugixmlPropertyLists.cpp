@@ -8,7 +8,7 @@
 
 #include "platform/Limits.h"
 #include "platform/System.h"
-#include "platform/ipc/WireText.h"
+#include "platform/TextEscape.h"
 
 namespace kyt {
 namespace {
@@ -133,7 +133,7 @@ class Reader {
         return wrong(child, "The element \"" + std::string(nameOf(node)) + "\" holds another element");
       all += child.value();
     }
-    if (!wire::isValidText(all)) return wrong(node, "The text is not valid UTF-8");
+    if (!isValidUTF8(all)) return wrong(node, "The text is not valid UTF-8");
     return all;
   }
 

@@ -8,8 +8,8 @@
 
 #include "backends/BackendTable.h"
 #include "daemon/ReportingdAgent.h"
-#include "platform/fake/FakeListener.h"
 #include "platform/fake/FakeProcessTransaction.h"
+#include "platform/ipc/fake/FakeListener.h"
 #include "tests/daemon/AgentFixture.h"
 
 namespace kyt {

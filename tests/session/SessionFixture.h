@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "platform/Keys.h"
-#include "platform/fake/FakeListener.h"
+#include "platform/ipc/fake/FakeListener.h"
 #include "session/ReportingdSession.h"
 #include "session/ReportingdSessionClass.h"
 #include "session/ReportingdSessionDelegate.h"

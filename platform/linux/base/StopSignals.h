@@ -7,7 +7,7 @@
 
 #include <chrono>
 
-#include "platform/ipc/ClientSessionInterface.h"
+#include "platform/Descriptor.h"
 
 namespace kyt {
 

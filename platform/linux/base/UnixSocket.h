@@ -8,7 +8,7 @@
 #include <variant>
 
 #include "platform/Error.h"
-#include "platform/ipc/Stream.h"
+#include "platform/Stream.h"
 
 namespace kyt {
 

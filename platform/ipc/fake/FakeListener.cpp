@@ -1,4 +1,4 @@
-#include "platform/fake/FakeListener.h"
+#include "platform/ipc/fake/FakeListener.h"
 
 #include <utility>
 
