@@ -136,6 +136,8 @@ const char* reasonName(Reason reason) {
       return "file-not-removed";
     case Reason::powerLogUnavailable:
       return "power-log-unavailable";
+    case Reason::powerLogEventDropped:
+      return "power-log-event-dropped";
     case Reason::numberOfReasons:
       break;
   }

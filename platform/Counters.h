@@ -80,12 +80,13 @@ enum class Reason : uint8_t {
   customIdentifierRefused,
   badUserDefaultsFile,
   badEntitlementsFile,
-  logLineDropped,       // nobody read standard error or the journal, and what may wait for that is full
-  messageLogLineLost,   // no file could be made or written, or it is full
-  messageLogShareUsed,  // a line of a user who has filled his part of the message log's file
-  valueNotPostable,     // a record's value removed because JSON cannot carry it
-  fileNotRemoved,       // an uploaded file that the broker could not or would not remove
-  powerLogUnavailable,  // a power-log event without a journal to take it
+  logLineDropped,        // nobody read standard error or the journal, and what may wait for that is full
+  messageLogLineLost,    // no file could be made or written, or it is full
+  messageLogShareUsed,   // a line of a user who has filled his part of the message log's file
+  valueNotPostable,      // a record's value removed because JSON cannot carry it
+  fileNotRemoved,        // an uploaded file that the broker could not or would not remove
+  powerLogUnavailable,   // a power-log event without a journal to take it
+  powerLogEventDropped,  // … for which there is no room, since the journal is slow or stopped
   numberOfReasons
 };
 

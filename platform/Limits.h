@@ -64,6 +64,8 @@ struct Limits {
   static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
   static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them
   static constexpr size_t maxQueuedLogBytes = 1u << 20;  // lines that wait for whoever reads the log
+  // Power-log events that wait for a journal that is slow or stopped.
+  static constexpr size_t maxQueuedPowerLogBytes = 1u << 20;
   // Of one text, above the debug level, for the clients of one user: the journal's own limit would hit everybody.
   static constexpr unsigned maxLogLinesPerSecond = 200;
   static constexpr uint64_t maxMessageLogBytes = 64u << 20;  // a day's file: clients cannot fill the disk

@@ -1,6 +1,6 @@
 // The platform's power-logging service: named events of numbered agents. Used by the back end that records
-// there. Any thread; never blocks for long; whether an event was kept is deliberately not told, since nobody
-// would act on it.
+// there. Any thread; never waits for whoever keeps them; whether an event was kept is deliberately not told, since
+// nobody would act on it.
 #pragma once
 
 #include <cstdint>

@@ -2,13 +2,17 @@
 // ChildProcess.h), where hideRun() comes first.
 #pragma once
 
+#include <fcntl.h>
 #include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <csignal>
 #include <cstring>
+#include <functional>
+#include <memory>
 #include <string>
 
 #include "tests/support/ChildProcess.h"
@@ -41,10 +45,45 @@ class TestJournal {
     const ssize_t count = ::recv(socket_, buffer, sizeof buffer, 0);
     return {buffer, static_cast<size_t>(count > 0 ? count : 0)};
   }
+  // … of one that comes in a file of memory. Empty where it comes otherwise, or the file could still be changed.
+  [[nodiscard]] std::string nextEntryInFile() const {
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    msghdr message = {};
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    if (::recvmsg(socket_, &message, MSG_CMSG_CLOEXEC) != 0 || message.msg_controllen < CMSG_LEN(sizeof(int)))
+      return {};
+    int file = -1;
+    std::memcpy(&file, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof file);
+    constexpr int kSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL;
+    struct stat status = {};
+    std::string entry;
+    if (::fcntl(file, F_GET_SEALS) == kSeals && ::fstat(file, &status) == 0) {
+      entry.resize(static_cast<size_t>(status.st_size));
+      if (::pread(file, entry.data(), entry.size(), 0) != status.st_size) entry.clear();
+    }
+    ::close(file);
+    return entry;
+  }
 
  private:
   const int socket_;
   bool isOpen_ = false;
 };
+
+// What `work` says in a process that finds a journal of its own; whoever waits for that is ended after a while.
+inline std::string withAJournal(const std::function<std::string(std::unique_ptr<TestJournal>&)>& work) {
+  return inChildProcess([&]() -> std::string {
+    std::signal(SIGALRM, SIG_DFL);
+    ::alarm(60);
+    if (!TestJournal::hideRun()) return "no mount namespace";
+    auto journal = std::make_unique<TestJournal>();
+    return journal->isOpen() ? work(journal) : "bind";
+  });
+}
+
+inline std::string messageOf(const std::string& entry) {
+  return entry.substr(0, entry.find('\n'));
+}
 
 }  // namespace kyt

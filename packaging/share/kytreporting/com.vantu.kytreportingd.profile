@@ -89,7 +89,7 @@ allow = [
   "read", "write", "readv", "writev", "pread64", "pwrite64", "lseek", "close",
   "recvmsg", "sendto", "recvfrom", "sendmsg", "sendmmsg", "shutdown",
   # Memory. What is executable comes from a file and cannot be written; memory never becomes executable later. Mapping
-  # code is needed late: libcurl, libsystemd, name-service modules, the diagnostics adaptor are loaded when first used.
+  # code is needed late: libcurl, name-service modules, the diagnostics adaptor are loaded when first used.
   "brk", "munmap", "mremap", "madvise",
   "mmap(*, *, no PROT_EXEC)",
   "mmap(*, *, only PROT_READ|PROT_EXEC, no MAP_ANONYMOUS)",

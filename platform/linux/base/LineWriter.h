@@ -1,7 +1,7 @@
-// Lines for a descriptor whose reader (of a pipe, of a socket of datagrams) may be slow, or read no more without closing: whoever writes never waits. A line
-// is written at once where there is room for it; otherwise it waits in a bounded queue, which a thread ("kyt-log")
-// writes out while somebody reads. What finds no room there is dropped and counted, and a line tells how many when there
-// is room again. Any thread.
+// Lines for a descriptor whose reader (of a pipe, of a socket of datagrams) may be slow, or read no more without
+// closing: whoever writes never waits. A line is written at once where there is room for it; otherwise it waits in a
+// bounded queue, which a thread ("kyt-log") writes out while somebody reads. What finds no room there is dropped and
+// counted, and a line tells how many when there is room again. Any thread.
 #pragma once
 
 #include <functional>

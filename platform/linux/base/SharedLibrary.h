@@ -1,8 +1,8 @@
 // A library of others that is loaded when something first needs it, not when the program starts: what libcurl
-// and libsystemd bring along would be most of an idle daemon's memory. It stays loaded until the process
-// ends, since libraries leave handlers behind that would be called after their code is gone.
+// brings along would be most of an idle daemon's memory. It stays loaded until the process ends, since libraries leave
+// handlers behind that would be called after their code is gone.
 //
-// Used by the seams of these libraries; their tables hold the functions. A library that is missing or too old
+// Used by the seams of such libraries; their tables hold the functions. A library that is missing or too old
 // is a text for the log, never the end of the process.
 #pragma once
 

@@ -1,15 +1,11 @@
 #include "platform/linux/system/LogSinks.h"
 
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
-
 #include <cerrno>
-#include <cstring>
 #include <utility>
 
 #include "platform/TextEscape.h"
 #include "platform/linux/system/Files.h"
+#include "platform/linux/system/JournalSocket.h"
 
 namespace kyt {
 namespace {
@@ -41,13 +37,11 @@ std::string aboutDropped(unsigned long long count) {
   return "log: " + std::to_string(count) + " lines were dropped, since nobody read them";
 }
 
-constexpr const char* kJournal = "/run/systemd/journal/socket";
 constexpr size_t kLongestOperation = 128;
 constexpr std::string_view kMessage = "MESSAGE=";
 constexpr std::string_view kPriority = "PRIORITY=";
 
-// By the journal's own protocol: a field a line, since no field has a line break once it is escaped. libsystemd would
-// wait while the journal takes nothing.
+// A field a line, since no field has a line break once it is escaped.
 std::string entryOfLine(const std::string& identifier, LogLevel level, std::string_view line) {
   std::string entry(kMessage);
   appendEscaped(entry, line);
@@ -57,14 +51,6 @@ std::string entryOfLine(const std::string& identifier, LogLevel level, std::stri
   if (colon != std::string_view::npos) appendEscaped(entry, line.substr(0, colon));
   entry += '\n';
   return entry;
-}
-
-// Also one that was started anew.
-bool connectToJournal(int socket) {
-  sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  std::strcpy(address.sun_path, kJournal);
-  return ::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 
 }  // namespace
@@ -85,39 +71,37 @@ void PatientStderrSink::write(LogLevel level, std::string_view line) {
 }
 
 bool JournalSink::isAvailable() {
-  struct stat status = {};
-  return ::stat(kJournal, &status) == 0 && S_ISSOCK(status.st_mode);
+  return JournalSocket::isThere();
 }
 
 std::unique_ptr<JournalSink> JournalSink::open(Counters& counters, std::string identifier,
                                                size_t maxQueuedBytes) {
-  const auto socket =
-      std::make_shared<FileHandle>(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  if (!*socket || !connectToJournal(socket->get())) {
+  auto socket = JournalSocket::open();
+  if (socket == nullptr) {
     StderrSink().write(LogLevel::error, "JournalSink(open): no journal: " + errorText(errno));
     return nullptr;
   }
   return std::unique_ptr<JournalSink>(
-      new JournalSink(socket->get(), socket, counters, std::move(identifier), maxQueuedBytes));
+      new JournalSink(std::move(socket), counters, std::move(identifier), maxQueuedBytes));
 }
 
-JournalSink::JournalSink(int socket, std::shared_ptr<const void> keepsSocket, Counters& counters,
-                         std::string identifier, size_t maxQueuedBytes)
-    : socket_(socket),
+JournalSink::JournalSink(std::shared_ptr<JournalSocket> socket, Counters& counters, std::string identifier,
+                         size_t maxQueuedBytes)
+    : socket_(std::move(socket)),
       identifier_(std::move(identifier)),
       fallback_(counters),
       entries_(
-          socket,
+          socket_->descriptor(),
           LineWriterOptions{
               maxQueuedBytes, [&counters] { counters.add(Reason::logLineDropped); },
               [name = identifier_](unsigned long long count) {
                 return entryOfLine(name, LogLevel::error, aboutDropped(count));
               },
               true, [this](const std::string& entry, bool lastTime) { return connectAgain(entry, lastTime); },
-              std::move(keepsSocket)}) {}
+              socket_}) {}
 
 bool JournalSink::connectAgain(const std::string& entry, bool lastTime) {
-  if (!lastTime && connectToJournal(socket_)) return true;
+  if (!lastTime && socket_->connectAgain()) return true;
   const std::string_view text = std::string_view(entry).substr(kMessage.size());
   const size_t end = text.find('\n');
   const char level = text.substr(end + 1 + kPriority.size()).front();

@@ -15,6 +15,8 @@
 
 namespace kyt {
 
+class JournalSocket;
+
 // A line each, in one write: "<7>" in front for debug, "<6>" for default, "<3>" for error.
 class StderrSink final : public LogSink {
  public:
@@ -53,12 +55,12 @@ class JournalSink final : public LogSink {
   [[nodiscard]] static bool isAvailable();
 
  private:
-  JournalSink(int socket, std::shared_ptr<const void> keepsSocket, Counters& counters, std::string identifier,
+  JournalSink(std::shared_ptr<JournalSocket> socket, Counters& counters, std::string identifier,
               size_t maxQueuedBytes);
   // Whether there is a journal to try again with; otherwise the entry has gone to standard error.
   [[nodiscard]] bool connectAgain(const std::string& entry, bool lastTime);
 
-  const int socket_;
+  const std::shared_ptr<JournalSocket> socket_;
   const std::string identifier_;
   PatientStderrSink fallback_;
   LineWriter entries_;

@@ -4,9 +4,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <csignal>
 #include <filesystem>
-#include <functional>
 #include <iterator>
 #include <memory>
 #include <thread>
@@ -186,21 +184,6 @@ TEST(JournalSink, SendsTheFieldsOfEachLine) {
       "KYT_OPERATION=Class(operation)\n--\n"
       "MESSAGE=Class(operation): a\\nPRIORITY=0\\xff\nPRIORITY=3\nSYSLOG_IDENTIFIER=kytreportingd\n"
       "KYT_OPERATION=Class(operation)\n--\n");
-}
-
-// What `work` says in a process that finds a journal of its own; whoever waits for that is ended after a while.
-std::string withAJournal(const std::function<std::string(std::unique_ptr<TestJournal>&)>& work) {
-  return inChildProcess([&]() -> std::string {
-    std::signal(SIGALRM, SIG_DFL);
-    ::alarm(60);
-    if (!TestJournal::hideRun()) return "no mount namespace";
-    auto journal = std::make_unique<TestJournal>();
-    return journal->isOpen() ? work(journal) : "bind";
-  });
-}
-
-std::string messageOf(const std::string& entry) {
-  return entry.substr(0, entry.find('\n'));
 }
 
 TEST(JournalSink, NobodyWaitsForAJournalThatIsStopped) {
