@@ -1,5 +1,6 @@
 #include "session/MessageLogFiles.h"
 
+#include <algorithm>
 #include <string_view>
 #include <utility>
 #include <variant>
@@ -66,12 +67,14 @@ void MessageLogFiles::writeToLogFile(uint32_t user, const char* format,
       formatObjects("(%@) ", {Date{now()}}) + escapedLines(formatObjects(format, objects)) + "\n";
   if (!takeShare(user, file->path, line.size())) return;
   if (file->size + line.size() > Limits::maxMessageLogBytes) {
-    if (!beginNext(*file, line.size()) || !takeShare(user, file->path, line.size())) return;
+    if (!beginNext(*file, line.size())) return giveShareBack(user, file->path, line.size());
+    if (!takeShare(user, file->path, line.size())) return;
   }
   if (const std::optional<Error> error = files_.append(file->path, line)) {
     log_.error("writeToLogFile: Error writing to log file %s: %s", file->path.c_str(),
                error->localizedDescription.c_str());
     deleteFile(*file);
+    giveShareBack(user, file->path, line.size());
     return lineIsLost();
   }
   log_.normal("writeToLogFile: Saved log message to %s", file->path.c_str());
@@ -95,6 +98,14 @@ bool MessageLogFiles::takeShare(uint32_t user, const std::string& path, size_t b
         "writeToLogFile: User %u has used his part of %s, his lines are left out until the next is begun",
         user, path.c_str());
   return false;
+}
+
+// A line that was lost after all uses nothing.
+void MessageLogFiles::giveShareBack(uint32_t user, const std::string& path, size_t bytes) {
+  MutexLock lock(mutex_);
+  if (path != sharedFile_) return;
+  uint64_t& used = shares_[user];
+  used -= std::min<uint64_t>(used, bytes);
 }
 
 // A full file gives way to the next one; there is one a second at most.

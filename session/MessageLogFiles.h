@@ -46,6 +46,7 @@ class MessageLogFiles final : public MessageLog {
   [[nodiscard]] bool beginNext(File& full, size_t wanted);
   // False: the user has used his share of that file, which has been counted.
   [[nodiscard]] bool takeShare(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
+  void giveShareBack(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
   void deleteFile(const File& file);
   void lineIsLost();
   [[nodiscard]] double now() const;

@@ -315,6 +315,30 @@ TEST_F(MessageLogFilesTest, AUserWhoHasUsedHisShareDoesNotBeginTheNextFile) {
   EXPECT_TRUE(contents().begin()->second.ends_with(" another's\n"));
 }
 
+TEST_F(MessageLogFilesTest, LinesThatAreLostDoNotUseAUsersShare) {
+  put(logFile("1"), 10, std::string(Limits::maxMessageLogBytes, '.'));
+  const std::string much = quarterOfAShare(line("").size());
+  files_.setFaults({.createFile = true});
+  for (int i = 0; i < 5; ++i) write(much, 1);
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 5U);
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 0U);
+  files_.setFaults({});
+  write("next", 1);
+  ASSERT_EQ(contents().size(), 1U);
+  EXPECT_EQ(contents().begin()->first, logFile("1769860800"));
+}
+
+TEST_F(MessageLogFilesTest, LinesThatCouldNotBeWrittenDoNotUseAUsersShare) {
+  const std::string much = quarterOfAShare(line("").size());
+  files_.setFaults({.append = true});
+  for (int i = 0; i < 5; ++i) write(much, 1);
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 5U);
+  files_.setFaults({});
+  write("next", 1);
+  EXPECT_EQ(contents(), (std::map<std::string, std::string>{{logFile("1769860800"), line("next")}}));
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 0U);
+}
+
 TEST_F(MessageLogFilesTest, KeepsLineBreaksAndEscapesOtherControlCharacters) {
   write("{\n    \"a\" : 1\n}\x1b[2J\r\xff\xe2\x80\xae\x7f\t.");
   EXPECT_EQ(contents().at(logFile("1769860800")),
