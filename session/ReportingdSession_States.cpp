@@ -64,7 +64,8 @@ void ReportingdSession::syncReportingStates() {
     backend->setSamplingThreshold(parentBackend->samplingThreshold());
     // The prefix is the same for every kind of back end, deliberately: log readers look for it.
     log().debug("HTTPSPostBackend(syncReportingStates): %s: state and sampling rate updated to %d, %.02f%%",
-                backend->name().c_str(), backend->state(), backend->samplingThreshold().doubleValue());
+                backend->name().c_str(), backend->state(),
+                static_cast<float>(backend->samplingThreshold().doubleValue()));
   }
 }
 

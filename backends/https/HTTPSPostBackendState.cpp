@@ -17,6 +17,11 @@ namespace {
 // Clients change their name and service rarely, if ever.
 constexpr size_t kMostMadeIdentifiers = 16;
 
+// Thresholds are shown as single-precision numbers: 0.615 as 0.62.
+double asShown(const Value& threshold) {
+  return static_cast<float>(threshold.doubleValue());
+}
+
 const String* textEntry(const Dictionary& dictionary, const char* key) {
   const Value* value = dictionary.find(key);
   return value != nullptr ? value->string() : nullptr;
@@ -239,7 +244,7 @@ int32_t HTTPSPostBackend::decideBySampling(const Dictionary& entry, const String
     Value changed = replacement != nullptr ? *replacement : Value();
     platform_.log.debug(
         "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f",
-        country->c_str(), threshold.doubleValue(), changed.doubleValue());
+        country->c_str(), asShown(threshold), asShown(changed));
     threshold = std::move(changed);
   }
   setSamplingThreshold(threshold);

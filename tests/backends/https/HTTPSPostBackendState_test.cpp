@@ -325,6 +325,16 @@ TEST_F(HTTPSPostBackendState, ACountrysThresholdReplacesTheGlobalOne) {
       logged("HTTPSPostBackend(updateBackendState): sampling threshold for US changed from 0.10 to 0.50"));
 }
 
+// As doubles they would be 0.61499… and 0.84499…, and so 0.61 and 0.84.
+TEST_F(HTTPSPostBackendState, ACountrysThresholdIsShownAsASinglePrecisionNumber) {
+  entry_.set("sampling_threshold", 0.615);
+  entry_.set("per_country_sampling_thresholds",
+             Array{Dictionary{{"country", Array{"US"}}, {"threshold", 0.845}}});
+  decide();
+  EXPECT_TRUE(
+      logged("HTTPSPostBackend(updateBackendState): sampling threshold for US changed from 0.62 to 0.85"));
+}
+
 TEST_F(HTTPSPostBackendState, ACountrysThresholdReplacesAMissingOneToo) {
   entry_.remove("sampling_threshold");
   entry_.set("per_country_sampling_thresholds",
