@@ -135,6 +135,25 @@ TEST_F(StorebagFetcherTest, ReportsAnUnchangedBag) {
   EXPECT_EQ(test_.sink.count(LogLevel::error, "fetchStorebag"), 0U);
 }
 
+TEST_F(StorebagFetcherTest, AnEmptyReplyWithADateMeansUnchangedWhateverItsStatusAndDate) {
+  lastModified_ = String("yesterday");
+  serve({200, {{"Last-Modified", "today"}}, "", std::nullopt});
+  EXPECT_FALSE(fetchSection());
+  EXPECT_TRUE(notModified_);
+  EXPECT_EQ(lastModified_, String("yesterday")) << "the bag in hand is still that one";
+  EXPECT_EQ(maxAge_, 86400);
+}
+
+TEST_F(StorebagFetcherTest, WithoutAPlaceForTheDateIsUnconditionalAndNeverUnchanged) {
+  serveBag(bag_, {{"Last-Modified", "today"}});
+  EXPECT_EQ(fetcher_.fetchStorebagWithName(String("torvel"), maxAge_, notModified_, nullptr), bag_);
+  EXPECT_TRUE(test_.urlSessions.lastRequest().headers.empty());
+  serve({200, {{"Last-Modified", "today"}}, "", std::nullopt});
+  EXPECT_FALSE(fetcher_.fetchStorebagWithName(String("torvel"), maxAge_, notModified_, nullptr));
+  EXPECT_FALSE(notModified_);
+  EXPECT_EQ(test_.sink.count("Last-Modified"), 0U);
+}
+
 TEST_F(StorebagFetcherTest, DoesNotTakeAnEmptyReplyForUnchangedWithoutADate) {
   lastModified_ = String("yesterday");
   serve({304, {}, "", std::nullopt});
@@ -276,6 +295,19 @@ TEST_F(StorebagFetcherTest, FailsWithoutASectionForTheEnvironment) {
   EXPECT_TRUE(test_.sink.contains(LogLevel::error, "for client type 5 with (null) environment"));
 }
 
+TEST_F(StorebagFetcherTest, FailsInTheSeedEnvironmentWithNeitherASeedNorAReleaseSection) {
+  serveBag(Dictionary{{"version", "2"}, {"development", section_}});
+  setEnvironment(3);
+  EXPECT_FALSE(fetchSection());
+  EXPECT_EQ(
+      test_.sink.count(LogLevel::error,
+                       "fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag."),
+      1U);
+  EXPECT_TRUE(test_.sink.contains(
+      LogLevel::error,
+      "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type 5 with seed environment"));
+}
+
 TEST_F(StorebagFetcherTest, PrefersASeedSectionToTheReleaseOne) {
   const Dictionary seed{{"qdx", Dictionary()}};
   serveBag(Dictionary{{"version", "2"}, {"release", section_}, {"seed", seed}});
@@ -316,6 +348,12 @@ TEST_F(StorebagFetcherTest, LogsTypeZeroAndFetchesNothingForIt) {
       LogLevel::error,
       "fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type 0"));
   EXPECT_EQ(test_.urlSessions.requestCount(), 0U);
+}
+
+TEST_F(StorebagFetcherTest, GoesOnWithoutANameForOtherTypesThatHaveNone) {
+  serveBag(bag_);
+  EXPECT_EQ(fetchSection(3), section_);
+  EXPECT_EQ(test_.urlSessions.lastRequest().url, std::string(kURL) + "/(null)?version=8.0");
 }
 
 TEST_F(StorebagFetcherTest, TheShutDownEndsADownloadUnderWayAndLetsNoOtherBegin) {

@@ -26,6 +26,11 @@ TEST_F(SessionStates, ReportsNoneWithoutBackEnds) {
   EXPECT_FALSE(client_.session->fetchReportingStates());
 }
 
+TEST_F(SessionStates, ReportsAnEmptyListWhenNoBackEndIsLive) {
+  factory_.prepare = [](RecordingBackend& made) { made.stateAfterUpdate = kBackendStateDisabled; };
+  EXPECT_EQ(configure({"httppost", "dashboard"}), Array());
+}
+
 TEST_F(SessionStates, CopiesTheParentsStateAndThreshold) {
   const Client parent = newConfigured({"httppost"}, sessionInfoAtLevel(0));
   factory_.latest("httppost")->setState(kBackendStateEnabled);
@@ -39,6 +44,17 @@ TEST_F(SessionStates, CopiesTheParentsStateAndThreshold) {
   EXPECT_TRUE(logged(
       LogLevel::debug,
       "HTTPSPostBackend(syncReportingStates): httppost: state and sampling rate updated to 2, 12.50%"));
+}
+
+// As a double it would be 0.61499…, and so 0.61.
+TEST_F(SessionStates, ShowsTheThresholdAsASinglePrecisionNumber) {
+  const Client parent = newConfigured({"httppost"}, sessionInfoAtLevel(0));
+  factory_.latest("httppost")->setSamplingThreshold(0.615);
+  configure(client_, {"httppost"}, sessionInfoAtLevel(1));
+  delegate_.parent = parent.session;
+  client_.session->syncReportingStates();
+  EXPECT_EQ(backend("httppost").samplingThreshold(), Value(0.615));
+  EXPECT_TRUE(logged(LogLevel::debug, "state and sampling rate updated to 2, 0.62%"));
 }
 
 TEST_F(SessionStates, DisablesABackEndThatTheParentLacks) {
@@ -133,6 +149,45 @@ TEST_F(SessionAggregation, PrefersAnAncestorToItself) {
   send(message(1, 2));
   EXPECT_EQ(ancestor.connection->messagesToClient().size(), 1U);
   EXPECT_TRUE(client_.connection->messagesToClient().empty());
+}
+
+// Whose client receives a message notes whether the agent's lock is held then.
+class LockNotingConnection final : public Connection, private ClientSessionReplyInterface {
+ public:
+  LockNotingConnection(FakeSessionDelegate& delegate, std::shared_ptr<SerialQueue> queue)
+      : delegate_(delegate), queue_(std::move(queue)) {}
+  std::vector<bool> locked;  // at each message
+
+  Value entitlementValue(std::string_view) override { return true; }
+  std::string description() const override { return "<noting>"; }
+  uint32_t peerUser() const override { return 1000; }
+  void setExportedObject(std::shared_ptr<ClientSessionInterface>) override {}
+  void setInterruptionHandler(Task) override {}
+  void setInvalidationHandler(Task) override {}
+  void resume() override {}
+  void invalidate() override {}
+  void finish() override {}
+  ClientSessionReplyInterface& remoteObjectProxy() override { return *this; }
+  const std::shared_ptr<SerialQueue>& queue() const override { return queue_; }
+
+ private:
+  std::optional<Error> sendMessageToClient(std::optional<Dictionary>, double, uint16_t, uint16_t,
+                                           std::optional<Dictionary>) override {
+    locked.push_back(delegate_.isLocked());
+    return std::nullopt;
+  }
+  FakeSessionDelegate& delegate_;
+  const std::shared_ptr<SerialQueue> queue_;
+};
+
+TEST_F(SessionAggregation, HoldsTheAgentsLockUntilTheAncestorHasTheMessage) {
+  const auto connection = std::make_shared<LockNotingConnection>(
+      delegate_, SerialQueue::create("test.connection", test_.executor));
+  delegate_.ancestor = ReportingdSession::initWithSessionDelegate(delegate_, connection, class_);
+  configure(client_, {"httppost"}, sessionInfoAtLevel(1));
+  ASSERT_EQ(connection->locked.size(), 1U) << "its start message";
+  send(message(1, 2));
+  EXPECT_EQ(connection->locked, (std::vector<bool>{true, true})) << "it must not end in between";
 }
 
 TEST_F(SessionAggregation, IsNotOfferedAMessageWithoutItsParameters) {
