@@ -1,5 +1,5 @@
 // HTTP requests. Callers: the storebag fetch (one process-wide session) and the connectivity helper of each reporting
-// session. The real one is libcurl on one network thread (platform/linux/CurlUrlSession.h).
+// session. The real one is libcurl on one network thread (platform/linux/url/CurlUrlSession.h).
 //
 // start() may be called from any thread and never blocks. A completion runs exactly once, on the URL session's own
 // serial delegate queue, never on the caller's thread before start() has returned, never on the network thread.

@@ -34,9 +34,6 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::sing
   return singleMessageHelper_;
 }
 
-// Deliberately unlike the session's own door: each back end works out its state first, gets the bare payload
-// without an envelope or shared data, with the serial number on internal builds, and always the flag 0;
-// nothing is aggregated.
 void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, uint16_t category) const {
   const std::string name = backend.name().str();
   platform().counters.add(Reason::eventFiltered);
@@ -47,6 +44,9 @@ void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, ui
         name.c_str(), category);
 }
 
+// Deliberately unlike the session's own door: each back end works out its state first, gets the bare payload
+// without an envelope or shared data, with the serial number on internal builds, and always the flag 0;
+// nothing is aggregated.
 void ReportingdSessionClass::sendMessageWithSessionInfo(
     uint32_t user, const std::optional<Dictionary>& sessionInfo, const std::optional<Dictionary>& userInfo,
     const std::optional<Dictionary>& storebag, uint16_t category, uint16_t type,
