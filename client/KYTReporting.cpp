@@ -210,7 +210,7 @@ void KYTReporting::sendSingleMessage(Options options, uint32_t category, uint32_
   options.onStateChange = nullptr;  // its context may be gone once the completion has run
   auto session = makeSession(std::move(options), true);
   session->enqueueCommand(std::move(command));
-  client::Loop::current()->add(std::move(session));
+  client::Loop::current()->add(session);
 }
 
 }  // namespace kyt

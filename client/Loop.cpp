@@ -53,25 +53,18 @@ bool Loop::isCurrentThread() const {
   return threadLoop == this;
 }
 
-void Loop::add(std::shared_ptr<Session> session) {
-  bool start = false;
+void Loop::add(const std::shared_ptr<Session>& session) {
+  bool ran = false, served = false;
   {
+    // Started under the lock: whoever adds meanwhile would rely on a thread that may never come.
     MutexLock lock(mutex_);
-    sessions_.push_back(session);
-    start = !running_;
-    running_ = true;
+    ran = running_;
+    served = running_ = ran || linux_client::startThread(
+                                   "kytreporting", [](void* loop) { static_cast<Loop*>(loop)->run(); }, this);
+    if (served) sessions_.push_back(session);
   }
-  if (!start) {
-    wakeUp_.wake();
-    return;
-  }
-  if (linux_client::startThread(
-          "kytreporting", [](void* loop) { static_cast<Loop*>(loop)->run(); }, this))
-    return;
-  MutexLock lock(mutex_);
-  running_ = false;
-  std::erase(sessions_, session);
-  session->becomeInert();
+  if (!served) session->endUnserved();
+  if (ran) wakeUp_.wake();
 }
 
 void Loop::noticeWork() {

@@ -21,7 +21,8 @@ class Loop {
   // The process's loop.
   static Loop* current();
 
-  void add(std::shared_ptr<Session> session);
+  // The session ends at once where the system gives no thread; others that have one, or get one, do not.
+  void add(const std::shared_ptr<Session>& session);
   // After something was queued: wakes the thread only if it sleeps.
   void noticeWork();
   // Wakes it whatever it does: a session was closed.

@@ -115,8 +115,9 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
 }
 
 Error Session::refusal() const {
-  return problem_.empty() ? clientError(ClientError::closed, "the session is closed")
-                          : clientError(ClientError::invalid, problem_);
+  if (!problem_.empty()) return clientError(ClientError::invalid, problem_);
+  if (unserved_) return clientError(ClientError::notConnected, standing_.why());
+  return clientError(ClientError::closed, "the session is closed");
 }
 
 void Session::noticeWork() {
@@ -180,6 +181,13 @@ void Session::close() {
 void Session::becomeInert() {
   inert_ = true;
   socket_.close();
+}
+
+void Session::endUnserved() {
+  const std::string reason = problem_.empty() ? "the system gives the library no thread" : problem_;
+  if (problem_.empty()) standing_.become(KYTReporting::State::noDaemon, reason);
+  unserved_ = true;
+  end(problem_.empty() ? ClientError::notConnected : ClientError::invalid, reason);
 }
 
 void Session::end(ClientError code, const std::string& reason) {

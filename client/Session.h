@@ -50,8 +50,10 @@ class Session {
   // completion has). Safe to call twice.
   void close();
 
-  // The library's thread, or a child process just forked.
+  // In a child process just forked.
   void becomeInert();
+  // There is no thread for it: the thread that opens it says so and ends it.
+  void endUnserved();
 
   // The library's thread: moves everything that can be moved now; whether anything was. False from isDone()
   // on.
@@ -135,6 +137,7 @@ class Session {
   MessageRing<Item> ring_;
   std::atomic<size_t> queuedBytes_{0};
   std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
+  std::atomic<bool> unserved_{false};       // there was no thread for it
   std::atomic<bool> commandQueued_{false};  // since the deadlines were last looked at
   std::atomic<uint64_t> sent_{0}, droppedQueueFull_{0}, lost_{0}, droppedClosed_{0}, droppedInvalid_{0},
       connections_{0}, waitedTooLong_{0}, replayFailed_{0}, sentUnconfigured_{0};

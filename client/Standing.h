@@ -1,8 +1,8 @@
 // Where a session stands, and who is told: the program by its block, and whoever set KYTREPORTING_DEBUG by lines
 // on standard error.
 //
-// Threads: state() and why() any thread; everything else the library's thread, and once nothing runs for the
-// session any more, the thread that closes it.
+// Threads: state() and why() any thread; everything else the library's thread, and where nothing runs for the session
+// (any more), the thread that opens or closes it.
 #pragma once
 
 #include <atomic>

@@ -104,7 +104,7 @@ class KYT_EXPORT KYTReporting {
     noLiveBackEnd = 4,  // configured, and no back end takes events
     live = 5,           // at least one back end takes events (filters and sampling may still leave some out)
   };
-  // "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live".
+  // "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live"; "" for what is no state.
   [[nodiscard]] static const char* nameOf(State state);
 
   struct Options {
@@ -155,7 +155,8 @@ class KYT_EXPORT KYTReporting {
   // absent, so a session with one sends nothing: sendMessage() returns false, and completions get this error.
   [[nodiscard]] static std::optional<Error> checkSessionInfo(const Dictionary& sessionInfo);
 
-  // Never blocks and never fails: a daemon that does not run yet is waited for.
+  // Never blocks and never fails: a daemon that does not run yet is waited for. Where the system gives the library no
+  // thread, the session has ended when this returns: completions get the code notConnected, stateReason() says so.
   [[nodiscard]] static std::unique_ptr<KYTReporting> open(Options options);
   // Closes without waiting: what was queued and not written is counted as lost. finish() first to keep it.
   ~KYTReporting();
