@@ -2,6 +2,7 @@
 #include "kytreporting/kytreporting.h"
 
 #include <algorithm>
+#include <cstring>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -91,6 +92,10 @@ KYTReporting::SuccessCompletion successCompletion(kyt_success_callback callback,
   };
 }
 
+void refuse(kyt_success_callback callback, void* context, const char* why) {
+  if (callback != nullptr) callback(0, why, context);
+}
+
 KYTReporting::ObjectCompletion objectCompletion(kyt_text_callback callback, void* context) {
   if (callback == nullptr) return nullptr;
   return [callback, context](const Value& result, const std::optional<kyt::Error>& error) {
@@ -108,6 +113,14 @@ void copyText(std::string_view text, char* out, size_t size) {
     --length;
   text.copy(out, length);
   out[length] = '\0';
+}
+
+// Read as bytes: another language may give a number that the type does not have.
+bool isState(const kyt_state& state) {
+  unsigned number = 0;
+  static_assert(sizeof number == sizeof state);
+  std::memcpy(&number, &state, sizeof number);
+  return number <= KYT_STATE_LIVE;
 }
 
 void append(kyt_array* array, Value value) {
@@ -213,6 +226,7 @@ int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds) {
              : 0;
 }
 const char* kyt_state_name(kyt_state state) {
+  if (!isState(state)) return nullptr;
   return KYTReporting::nameOf(static_cast<KYTReporting::State>(state));
 }
 kyt_state kyt_session_state(const kyt_session* session) {
@@ -256,13 +270,15 @@ void kyt_session_flush(kyt_session* session, kyt_text_callback callback, void* c
 }
 void kyt_session_upload_file(kyt_session* session, const char* path, kyt_success_callback callback,
                              void* context) {
-  if (session != nullptr && path != nullptr)
-    session->reporting->uploadFile(path, successCompletion(callback, context));
+  if (session == nullptr) return;
+  if (path == nullptr) return refuse(callback, context, "the path is null");
+  session->reporting->uploadFile(path, successCompletion(callback, context));
 }
 void kyt_session_upload_log_data(kyt_session* session, const kyt_array* log_data,
                                  kyt_success_callback callback, void* context) {
-  if (session != nullptr && log_data != nullptr)
-    session->reporting->uploadLogData(log_data->value, successCompletion(callback, context));
+  if (session == nullptr) return;
+  if (log_data == nullptr) return refuse(callback, context, "the array is null");
+  session->reporting->uploadLogData(log_data->value, successCompletion(callback, context));
 }
 void kyt_session_update_shared_data(kyt_session* session, const kyt_dictionary* entries) {
   if (session != nullptr && entries != nullptr) session->reporting->updateSharedData(entries->value);
@@ -291,7 +307,10 @@ void kyt_session_statistics(const kyt_session* session, kyt_statistics* statisti
 }
 void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, kyt_text_callback callback, void* context) {
-  if (options == nullptr || options->size == 0) return;
+  if (options == nullptr || options->size == 0) {
+    if (callback != nullptr) callback(nullptr, "the options are missing", context);
+    return;
+  }
   KYTReporting::sendSingleMessage(optionsOf(*options), category, type, optional(payload),
                                   [callback, context](std::string text, std::optional<kyt::Error> error) {
                                     if (callback == nullptr) return;

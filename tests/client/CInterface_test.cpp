@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
 #include <future>
+#include <string>
+#include <vector>
 
 #include "kytreporting/kytreporting.h"
 #include "tests/client/AnswerOf.h"
@@ -103,6 +105,38 @@ TEST(CInterface, AsksForAnswersUploadsAndLogData) {
   EXPECT_EQ(daemon.count("LogData 4"), 1u);
   EXPECT_EQ(daemon.count("Upload file://"), 1u);
   kyt_session_close(session);
+}
+
+TEST(CInterface, CallsBackWhateverElseIsNull) {
+  kyt_options options{};
+  options.size = sizeof options;
+  kyt_session* session = kyt_session_open(&options);
+  const kyt_success_callback keep = [](int success, const char* error, void* context) {
+    *static_cast<std::string*>(context) = success != 0 ? "success" : error != nullptr ? error : "";
+  };
+  std::string file, log, single;
+  kyt_session_upload_file(session, nullptr, keep, &file);
+  EXPECT_EQ(file, "the path is null");
+  kyt_session_upload_log_data(session, nullptr, keep, &log);
+  EXPECT_EQ(log, "the array is null");
+  kyt_session_upload_file(session, nullptr, nullptr, nullptr);
+  const kyt_text_callback keepError = [](const char* text, const char* error, void* context) {
+    if (text == nullptr && error != nullptr) *static_cast<std::string*>(context) = error;
+  };
+  kyt_send_single_message(nullptr, 1, 2, nullptr, keepError, &single);
+  EXPECT_EQ(single, "the options are missing");
+  kyt_send_single_message(nullptr, 1, 2, nullptr, nullptr, nullptr);
+  kyt_session_upload_file(nullptr, "x", keep, &(file = "nothing"));
+  EXPECT_EQ(file, "nothing") << "without a session nobody is called";
+  kyt_session_close(session);
+}
+
+TEST(CInterface, NamesStatesAndNothingElse) {
+  const std::vector<std::string> names = {"no-daemon",   "refused",          "connected",
+                                          "no-storebag", "no-live-back-end", "live"};
+  for (unsigned i = 0; i < names.size(); ++i) EXPECT_EQ(kyt_state_name(static_cast<kyt_state>(i)), names[i]);
+  for (const unsigned none : {6U, 255U, 256U, 261U, 65536U, ~0U})
+    EXPECT_EQ(kyt_state_name(static_cast<kyt_state>(none)), nullptr) << none;
 }
 
 TEST(CInterface, ReceivesAggregatedMessages) {

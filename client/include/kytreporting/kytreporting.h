@@ -8,8 +8,10 @@
  *
  * Strings are UTF-8 and NUL-terminated and are copied. Objects made by kyt_..._new are owned by the caller
  * until they are freed or taken by a function that says so. Functions that answer int answer 1 for yes and 0
- * for no. A null session, dictionary or key is an error of the caller that is answered with 0 or nothing. KYTREPORTING_DEBUG=1 in the environment makes every change of a
- * session's state, and every drop, a line on standard error.
+ * for no. A null session, dictionary or key is an error of the caller that is answered with 0 or nothing: without a
+ * session there is no callback either. Every other call that takes a callback runs it, whatever else is null.
+ * KYTREPORTING_DEBUG=1 in the environment makes every change of a session's state, and every drop, a line on standard
+ * error.
  */
 #ifndef KYTREPORTING_H
 #define KYTREPORTING_H
@@ -84,7 +86,8 @@ typedef enum kyt_state {
   KYT_STATE_NO_LIVE_BACK_END = 4, /* configured, and no back end takes events */
   KYT_STATE_LIVE = 5              /* at least one back end takes events */
 } kyt_state;
-/* "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live"; never freed. */
+/* "no-daemon", "refused", "connected", "no-storebag", "no-live-back-end", "live"; never freed. Null for a number that is
+ * no state. */
 KYT_API const char* kyt_state_name(kyt_state state);
 /* `why` is a text for people. */
 typedef void (*kyt_state_callback)(kyt_state state, const char* why, void* context);
@@ -147,7 +150,7 @@ KYT_API void kyt_session_set_digest_key(kyt_session* session, const void* bytes,
                                         int32_t algorithm);
 
 /* Whether a back end took it. The file is opened at once, with the caller's rights; a file that cannot be opened is
- * answered before the call returns. The array stays the caller's. */
+ * answered before the call returns, and so is a null path or array. The array stays the caller's. */
 KYT_API void kyt_session_upload_file(kyt_session* session, const char* path, kyt_success_callback callback,
                                      void* context);
 KYT_API void kyt_session_upload_log_data(kyt_session* session, const kyt_array* log_data,
@@ -159,7 +162,7 @@ typedef struct kyt_statistics {
 } kyt_statistics;
 KYT_API void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics);
 
-/* One event without a session of its own; the callback gets "finished", or what went wrong. */
+/* One event without a session of its own; the callback gets "finished", or what went wrong: null options too. */
 KYT_API void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                                      const kyt_dictionary* payload, kyt_text_callback callback,
                                      void* context);
