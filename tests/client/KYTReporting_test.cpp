@@ -11,9 +11,13 @@
 
 #include <atomic>
 #include <future>
+#include <set>
+#include <span>
+#include <string>
 #include <thread>
 
 #include "client/Loop.h"
+#include "platform/SessionInfoKeys.h"
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
@@ -360,6 +364,24 @@ TEST_F(KYTReportingTest, NamesTheKeyThatIsWrongInASessionsInformation) {
   EXPECT_EQ(problemOf({}), "none");
   EXPECT_EQ(problemOf({{"SessionID", ~0U}, {"ClientType", 23}, {"BatchEvent", 1}, {"RequireUserInfo", 0U}}),
             "none");
+}
+
+TEST_F(KYTReportingTest, TypedInformationHasEveryKeyThatThereIs) {
+  const auto keysOf = [](const Dictionary& dictionary) {
+    std::set<std::string> keys;
+    for (const DictionaryEntry& entry : dictionary) keys.insert(entry.key.str());
+    return keys;
+  };
+  const auto expected = [](std::span<const SessionInfoKey> table) {
+    std::set<std::string> keys;
+    for (const SessionInfoKey& one : table) keys.insert(one.key);
+    return keys;
+  };
+  const Dictionary info = SessionInfo{.hierarchyToken = SessionInfo::HierarchyToken{"t", 1}};
+  EXPECT_EQ(keysOf(info), expected(sessionInfoKeys()));
+  const Dictionary token = *info.find(kKYTReportingSessionInfoHierarchyToken)->dictionary();
+  EXPECT_EQ(keysOf(token), expected(hierarchyTokenKeys()));
+  EXPECT_FALSE(KYTReporting::checkSessionInfo(info));
 }
 
 TEST_F(KYTReportingTest, SendsNothingForASessionWhoseInformationIsWrong) {
