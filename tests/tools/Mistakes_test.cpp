@@ -54,6 +54,18 @@ TEST_F(Mistakes, NoEntitlementIsToldByTheLog) {
       refused.text.find("the daemon refuses this user and program (kytctl entitlements check says why)"),
       std::string::npos)
       << refused.text;
+  // At once, whatever the time-out.
+  const ProgramRun session =
+      kytctl({"session", "--timeout", "600", "-"},
+             "{\"do\":\"open\",\"sessionInfo\":{\"ClientType\":20}}\n{\"do\":\"configure\"}\n");
+  EXPECT_EQ(session.status, 1);
+  EXPECT_NE(session.text.find("kytctl: configure: " + socket() + ": "), std::string::npos) << session.text;
+  EXPECT_NE(
+      session.text.find(
+          ": the daemon refuses this user and program (kytctl entitlements check says why), or has too many "
+          "connections\n"),
+      std::string::npos)
+      << session.text;
   expectTold("listener: Refused connection ");
   expectTold("no grant gives it the entitlement, see \"kytctl entitlements check --user ");
 }

@@ -22,6 +22,7 @@ constexpr char kSocketPath[] = "/run/kytreportingd/com.vantu.kytreportingd";
 
 void Answer::set(std::string text, std::optional<Error> error) {
   const std::lock_guard lock(mutex_);
+  if (set_) return;
   text_ = std::move(text);
   error_ = std::move(error);
   set_ = true;
@@ -33,6 +34,25 @@ std::optional<std::pair<std::string, std::optional<Error>>> Answer::wait(double 
   if (!changed_.wait_for(lock, std::chrono::duration<double>(seconds), [this] { return set_; }))
     return std::nullopt;
   return std::pair(text_, error_);
+}
+
+void Refusal::become(KYTReporting::State state, const std::string& why) {
+  const std::lock_guard lock(mutex_);
+  why_.reset();
+  if (state != KYTReporting::State::refused) return;
+  why_ = why;
+  if (const auto call = call_.lock()) call->set({}, Error{{}, 0, why});
+}
+
+void Refusal::answers(const std::shared_ptr<Answer>& call) {
+  const std::lock_guard lock(mutex_);
+  call_ = call;
+  if (why_) call->set({}, Error{{}, 0, *why_});
+}
+
+std::optional<std::string> Refusal::why() const {
+  const std::lock_guard lock(mutex_);
+  return why_;
 }
 
 std::string socketPath(const ConnectionOptions& connection) {

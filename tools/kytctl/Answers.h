@@ -10,13 +10,14 @@
 #include <utility>
 #include <vector>
 
+#include "kytreporting/KYTReporting.h"
 #include "platform/Error.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {
 
 // What a completion said, waited for by the command's own thread. Shared: the completion may come after the
-// time-out.
+// time-out. What is said first stands.
 class Answer {
  public:
   void set(std::string text, std::optional<Error> error);
@@ -29,6 +30,22 @@ class Answer {
   std::string text_;
   std::optional<Error> error_;
   bool set_ = false;
+};
+
+// What a session's calls wait for besides their answers: that the daemon refuses them. The library goes on trying, since
+// a grant may come; a command says so instead and ends. The state comes on the library's thread.
+class Refusal {
+ public:
+  void become(KYTReporting::State state, const std::string& why);
+  // From now on a refusal is this call's answer. It is at once, if the daemon refuses already.
+  void answers(const std::shared_ptr<Answer>& call);
+  // Why it refuses now, or none.
+  [[nodiscard]] std::optional<std::string> why() const;
+
+ private:
+  mutable std::mutex mutex_;
+  std::optional<std::string> why_;
+  std::weak_ptr<Answer> call_;
 };
 
 // The socket that is meant: --socket, below --root, the environment's KYTREPORTING_SOCKET, or the fixed one.

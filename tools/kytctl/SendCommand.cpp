@@ -1,4 +1,5 @@
 // One event by hand, without a session.
+#include <chrono>
 #include <cstdio>
 #include <memory>
 
@@ -28,6 +29,7 @@ int sendCommand(const ConnectionOptions& connection, const SendOptions& given) {
     if (!std::get<Value>(userInfo).isDictionary()) return failed("--user-info is a JSON object");
     options.userInfo = *std::get<Value>(userInfo).dictionary();
   }
+  options.callDeadline = std::chrono::milliseconds(0);  // --timeout counts
   auto answer = std::make_shared<Answer>();
   KYTReporting::sendSingleMessage(std::move(options), given.category, given.type,
                                   *std::get<Value>(payload).dictionary(),

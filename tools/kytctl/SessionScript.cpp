@@ -135,10 +135,20 @@ int SessionScript::open(const Dictionary& step) {
     options.aggregationBlock = [aggregated = aggregated_](const AggregatedMessage& message) {
       aggregated->print(message);
     };
+  options.callDeadline = std::chrono::milliseconds(0);  // --timeout counts
+  refusal_ = std::make_shared<Refusal>();
+  options.onStateChange = [refusal = refusal_](KYTReporting::State state, const std::string& why) {
+    refusal->become(state, why);
+  };
   session_ = KYTReporting::open(std::move(options));
   answered_ = 0;
   configured_ = false;
   return 0;
+}
+
+int SessionScript::reportCall(const std::shared_ptr<Answer>& answer, const std::string& what) {
+  refusal_->answers(answer);
+  return report(answer, connection_, what);
 }
 
 int SessionScript::wait(const Dictionary& step) {
@@ -152,7 +162,7 @@ int SessionScript::configure(const Dictionary&) {
   session_->startConfiguration([answer](auto states, std::optional<Error> error) {
     answer->set(statesText(states), std::move(error));
   });
-  return report(answer, connection_, "configure");
+  return reportCall(answer, "configure");
 }
 
 int SessionScript::states(const Dictionary& step) {
@@ -160,7 +170,7 @@ int SessionScript::states(const Dictionary& step) {
   session_->fetchStates(dictionaryAt(step, "userInfo"), [answer](auto states, std::optional<Error> error) {
     answer->set(statesText(states), std::move(error));
   });
-  return report(answer, connection_, "states");
+  return reportCall(answer, "states");
 }
 
 int SessionScript::send(const Dictionary& step) {
@@ -177,7 +187,8 @@ int SessionScript::send(const Dictionary& step) {
       if (const int status = sendWithReply(category, type, payload, flag); status != 0) return status;
       continue;
     }
-    if (!waitForRoom()) return failedCall(connection_, "send", "the queue stays full");
+    if (!waitForRoom())
+      return failedCall(connection_, "send", refusal_->why().value_or("the queue stays full"));
     if (!session_->sendMessage(category, type, payload, flag))
       return failed("send: the message does not fit into the queue");
   }
@@ -190,7 +201,7 @@ int SessionScript::sendWithReply(uint16_t category, uint16_t type, const Diction
                         [answer](const Value& value, std::optional<Error> error) {
                           answer->set(value.isNull() ? "" : description(value), std::move(error));
                         });
-  const int status = report(answer, connection_, "send");
+  const int status = reportCall(answer, "send");
   if (status == 0) ++answered_;
   return status;
 }
@@ -200,7 +211,7 @@ bool SessionScript::waitForRoom() {
   const auto deadline =
       std::chrono::steady_clock::now() + std::chrono::duration<double>(connection_.timeoutSeconds);
   while (session_->statistics().queued >= kQueued) {
-    if (std::chrono::steady_clock::now() >= deadline) return false;
+    if (refusal_->why() || std::chrono::steady_clock::now() >= deadline) return false;
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
   return true;
@@ -211,7 +222,7 @@ int SessionScript::flush(const Dictionary&) {
   session_->flush([answer](const Value& value, std::optional<Error> error) {
     answer->set(value.isNull() ? "flushed" : description(value), std::move(error));
   });
-  return report(answer, connection_, "flush");
+  return reportCall(answer, "flush");
 }
 
 int SessionScript::displayURL(const Dictionary&) {
@@ -219,7 +230,7 @@ int SessionScript::displayURL(const Dictionary&) {
   session_->fetchDisplayURL([answer](std::string url, std::optional<Error> error) {
     answer->set(std::move(url), std::move(error));
   });
-  return report(answer, connection_, "displayURL");
+  return reportCall(answer, "displayURL");
 }
 
 int SessionScript::sharedData(const Dictionary& step) {
@@ -244,7 +255,8 @@ int SessionScript::finish(const Dictionary&) {
               static_cast<unsigned long long>(figures.sent + answered_),
               static_cast<unsigned long long>(figures.lostOnConnectionEnd),
               static_cast<unsigned long long>(figures.droppedQueueFull + figures.droppedInvalid));
-  return done ? 0 : failedCall(connection_, "finish", "the daemon did not take everything in time");
+  const char* const late = "the daemon did not take everything in time";
+  return done ? 0 : failedCall(connection_, "finish", refusal_->why().value_or(late));
 }
 
 }  // namespace kyt::tools

@@ -42,10 +42,12 @@ class SessionScript {
   int wait(const Dictionary& step);
   int finish(const Dictionary& step);
   [[nodiscard]] bool waitForRoom();
+  int reportCall(const std::shared_ptr<Answer>& answer, const std::string& what);
 
   const ConnectionOptions& connection_;
   const std::map<std::string, Step> steps_;
   const std::shared_ptr<Aggregated> aggregated_;  // also the library's thread's
+  std::shared_ptr<Refusal> refusal_;              // of the session; likewise
   uint64_t answered_ = 0;                         // messages that were sent with a reply, and got one
   bool configured_ = false;                       // what is sent before is dropped by the daemon
   std::unique_ptr<KYTReporting> session_;
