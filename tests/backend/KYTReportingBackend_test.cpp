@@ -5,6 +5,7 @@
 #include <openssl/sha.h>
 
 #include "backend/Text.h"
+#include "platform/Counters.h"
 #include "platform/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
 
@@ -188,6 +189,7 @@ TEST_F(KYTReportingBackendTest, TheBaseAloneDoesNothing) {
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, MessageFlag{}).isNull());
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}).isNull());
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}, MessageFlag{}).isNull());
+  EXPECT_EQ(platform_.counters.value(Reason::notForThisBackEnd), 3u) << "each by itself";
   std::optional<FileExtension> extension;
   EXPECT_FALSE(plain->uploadFileAtPath("/a", "token", extension));
   EXPECT_FALSE(plain->uploadLogData(Value(Array{})));

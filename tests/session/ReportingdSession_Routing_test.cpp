@@ -335,6 +335,8 @@ TEST_F(SingleMessage, TheClassRefusesMissingInformation) {
                 "RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters"),
             2U);
   EXPECT_TRUE(factory_.made().empty());
+  EXPECT_EQ(test_.counters.value(Reason::identifiersMissing), 1U);
+  EXPECT_EQ(test_.counters.value(Reason::noStorebag), 1U);
 }
 
 TEST_F(SingleMessage, ConcurrentFirstOnesShareOneHelper) {
@@ -394,6 +396,25 @@ TEST_F(DroppedMessages, AreToldOnceForEachReasonAtTheDefaultLevel) {
   configure({"httppost"});
   for (int i = 0; i < 3; ++i) send(Dictionary{{"Category", 1}});
   EXPECT_EQ(told("are dropped: they have no \"Category\" or no \"Type\""), 1U);
+}
+
+TEST_F(DroppedMessages, WithoutACategoryAreToldToo) {
+  configure({"httppost"});
+  send(Dictionary{{"Type", 1}});
+  EXPECT_EQ(test_.sink.count("are dropped: they have no \"Category\" or no \"Type\""), 1U);
+}
+
+// One of the two is enough to be told.
+TEST_F(DroppedMessages, AnOddCategoryAloneIsTold) {
+  configure({"httppost"});
+  send(Dictionary{{"Category", -1}, {"Type", 2}});
+  EXPECT_TRUE(test_.sink.contains(LogLevel::normal, "-1 and 2 are read as 65535 and 2"));
+}
+
+TEST_F(DroppedMessages, AnOddTypeAloneIsTold) {
+  configure({"httppost"});
+  send(Dictionary{{"Category", 1}, {"Type", 65536U}});
+  EXPECT_TRUE(test_.sink.contains(LogLevel::normal, "1 and 65536 are read as 1 and 0"));
 }
 
 // They are taken all the same.

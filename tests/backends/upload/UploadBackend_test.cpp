@@ -301,6 +301,20 @@ TEST_F(Upload, TheFinishedAddressIsJudged) {
   EXPECT_EQ(poster_->requests.size(), 5u);
 }
 
+// What stands behind a "post_url" that is an address by itself.
+TEST_F(Upload, AnIdentifierThatCanStandInNoAddressMakesNoRequest) {
+  for (const char* udid : {"a b", "a\n", "a\x7f", "50%", "%zz"}) {
+    platform_.sink.clear();
+    backend().setUdid(udid);
+    EXPECT_FALSE(upload()) << udid;
+    EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Unable to create URL request"))
+        << udid;
+  }
+  EXPECT_TRUE(poster_->requests.empty());
+  backend().setUdid("a%20b");
+  EXPECT_TRUE(upload());
+}
+
 TEST_F(Upload, ASchemeMayBeInCapitals) {
   profile_.set("post_url", "HTTPS://upload.example.org/in");
   EXPECT_TRUE(upload());
