@@ -89,6 +89,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   };
 
   void tellRefusal(const Connection& connection);
+  void tellUnshared(const ReportingdSession& session);
   void sessionWasInvalidated(const std::shared_ptr<ReportingdSession>& session);
   void removeFromGroups(ReportingdSession& session) REQUIRES(monitor_);
   [[nodiscard]] bool addGroup(const String& token, ReportingdSession& session) REQUIRES(monitor_);

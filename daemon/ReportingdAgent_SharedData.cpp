@@ -16,13 +16,24 @@ void ReportingdAgent::updateSharedDataForSession(ReportingdSession& session, con
   Platform& platform = configuration_.platform;
   MonitorLock lock(monitor_);
   const std::optional<String> token = session.hierarchyToken();
-  if (!token) return;
+  if (!token) return tellUnshared(session);
   if (_sharedData.update(*token, sharedData, session.peerUser())) return;
   if (platform.counters.addAndMayLog(Reason::sharedDataRefused, platform.clock.monotonic()))
     platform.log.error(
         "updateSharedDataForSession: User %u shares %llu bytes, too many for the update of session %u",
         session.peerUser(), static_cast<unsigned long long>(_sharedData.bytesOfUser(session.peerUser())),
         session.sessionID());
+}
+
+// Nobody shares with a session that belongs to no hierarchy.
+void ReportingdAgent::tellUnshared(const ReportingdSession& session) {
+  Platform& platform = configuration_.platform;
+  platform.counters.add(Reason::sharedDataRefused);
+  const std::string user = std::to_string(session.peerUser());
+  if (!platform.counters.mayTell(Reason::sharedDataRefused, user, platform.clock.monotonic())) return;
+  platform.log.normal(
+      "updateSharedDataForSession: Session %u of user %s shares data and has no hierarchy token, it is left out",
+      session.sessionID(), user.c_str());
 }
 
 void ReportingdAgent::removeObjectFromSharedDataForSession(ReportingdSession& session, const String& key) {

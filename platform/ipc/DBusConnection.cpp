@@ -272,10 +272,13 @@ std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionar
       }
       return std::nullopt;
     case ConnectionOutput::Sent::refused:
-      return Error{"KYTReportingErrorDomain", -1, "The message is too large"};
     case ConnectionOutput::Sent::closed:
       break;
   }
+  // Nobody misses the end of an aggregation when its client is gone.
+  if (!isEnd) context_->services.counters.add(Reason::aggregatorMessageDropped);
+  if (sent == ConnectionOutput::Sent::refused)
+    return Error{"KYTReportingErrorDomain", -1, "The message is too large or nested too deeply"};
   return Error{"KYTReportingErrorDomain", -1, "The connection was invalidated"};
 }
 

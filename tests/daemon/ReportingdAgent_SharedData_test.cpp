@@ -44,6 +44,26 @@ TEST_F(AgentSharedData, IsNotForSessionsWithoutAToken) {
   EXPECT_FALSE(shared(a));
 }
 
+TEST_F(AgentSharedData, OfASessionWithoutATokenIsCountedAndToldOnceAMinuteForEachUser) {
+  const Client a = clientWith(sessionInfo(7, 3)), other = clientWith(sessionInfo(), false, 1001);
+  const auto told = [this](const char* user) {
+    return test_.sink.count(LogLevel::normal, std::string("of user ") + user +
+                                                  " shares data and has no hierarchy token, it is left out");
+  };
+  update(a, Dictionary{{"k", 1}});
+  update(a, Dictionary{{"k", 2}});
+  EXPECT_EQ(test_.counters.value(Reason::sharedDataRefused), 2U);
+  EXPECT_EQ(told("1000"), 1U);
+  EXPECT_TRUE(logged(LogLevel::normal, "updateSharedDataForSession: Session 3 of user 1000 shares data"));
+  a.session->updateSharedDataForKey("k", nullptr);
+  EXPECT_EQ(test_.counters.value(Reason::sharedDataRefused), 2U) << "there was nothing to take away";
+  update(other, Dictionary{{"k", 1}});
+  EXPECT_EQ(told("1001"), 1U);
+  test_.clock.advance(std::chrono::minutes(1));
+  update(a, Dictionary{{"k", 3}});
+  EXPECT_EQ(told("1000"), 2U);
+}
+
 TEST_F(AgentSharedData, ReachesTheBackEndsOfTheWholeHierarchy) {
   const Client a = clientWith(sessionInfoAt(0));
   Client b = clientWith(sessionInfoAt(1));

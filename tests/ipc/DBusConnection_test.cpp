@@ -548,9 +548,25 @@ TEST_F(DBusConnectionTest, NothingIsKeptForAClientThatPassedTwiceTheLimit) {
   session_->held[0](Array{std::string(50000, 'x')});
   EXPECT_TRUE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 1, 2, std::nullopt))
       << "before its queue has seen to the end";
+  EXPECT_EQ(counters_.value(Reason::aggregatorMessageDropped), 1u);
+  EXPECT_TRUE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 0, 0, std::nullopt));
+  EXPECT_EQ(counters_.value(Reason::aggregatorMessageDropped), 1u) << "nobody misses the end of aggregation";
   executor_.runAll();
   EXPECT_EQ(invalidations_, 1);
   EXPECT_TRUE(pipe_->closed);
+}
+
+TEST_F(DBusConnectionTest, AMessageThatCannotBeWrittenIsAnErrorAndCounted) {
+  shakeHands();
+  Value nested = 1;
+  for (int depth = 0; depth < 70; ++depth) nested = Value(Array{nested});
+  const auto error = connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 1, 2,
+                                                                          Dictionary{{"nested", nested}});
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->localizedDescription, "The message is too large or nested too deeply");
+  EXPECT_EQ(counters_.value(Reason::aggregatorMessageDropped), 1u);
+  EXPECT_FALSE(connection_->remoteObjectProxy().sendMessageToClient(std::nullopt, 0, 1, 2, std::nullopt));
+  EXPECT_EQ(counters_.value(Reason::aggregatorMessageDropped), 1u);
 }
 
 // Others end a session's aggregation: what they send must not cut it off.
