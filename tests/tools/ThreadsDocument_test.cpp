@@ -1,0 +1,54 @@
+// The page about threads names each queue and each thread of the daemon, and none that is not there.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+
+#include "tests/tools/ManualText.h"
+
+namespace kyt {
+namespace {
+
+// The first group of every match in the daemon's own sources.
+Names inSources(const char* expression) {
+  Names found;
+  for (const char* folder : {"platform", "config", "backend", "backends", "session", "daemon"})
+    for (const auto& entry :
+         std::filesystem::recursive_directory_iterator(KYT_SOURCE_DIR "/" + std::string(folder))) {
+      const std::string path = entry.path().string();
+      if (!entry.is_regular_file() || path.find("/fake/") != path.npos) continue;
+      found.merge(matchesIn(textOf(path.substr(sizeof KYT_SOURCE_DIR)), expression));
+    }
+  return found;
+}
+
+// The names in the first column of the table beneath that heading.
+Names inTable(const std::string& heading) {
+  Names names;
+  bool inside = false;
+  for (const std::string& line : linesOf(textOf("docs/THREADS.md"))) {
+    if (line.starts_with("## ")) inside = line == "## " + heading;
+    if (inside && line.starts_with("| `"))
+      names.merge(matchesIn(line.substr(0, line.find('|', 1)), "`([^`]+)`"));
+  }
+  return names;
+}
+
+TEST(ThreadsDocument, NamesEveryQueue) {
+  const Names queues = inSources("SerialQueue::create\\(\"([^\"]+)\"");
+  EXPECT_GE(queues.size(), 8U);
+  EXPECT_EQ(inTable("Queues"), queues);
+}
+
+TEST(ThreadsDocument, NamesEveryThread) {
+  Names threads = inSources(
+      "(?:beginServiceThread\\(|EpollReactor::create\\(|[. ]name = |Implementation>\\()\"(kyt-[a-z]+)\"");
+  threads.merge(inSources("const char\\* (?:thread)?[nN]ame = \"(kyt-[a-z]+)\""));
+  Names documented;
+  for (const std::string& name : inTable("Threads of the daemon"))
+    if (name.starts_with("kyt-"))
+      documented.insert(name.ends_with("-N") ? name.substr(0, name.size() - 2) : name);
+  EXPECT_EQ(documented, threads);
+}
+
+}  // namespace
+}  // namespace kyt
