@@ -1,5 +1,5 @@
-// Every limit in one place, with its unit and its reason. What passes a limit is refused or dropped, counted
-// (platform/Counters.h) and logged at most once a minute for each limit.
+// What clients, users and servers may take of the daemon, each with its unit and reason; a limit of one format or helper
+// stands beside its code. What passes one is refused or dropped, counted (platform/Counters.h) and logged once a minute.
 #pragma once
 
 #include <cstddef>
