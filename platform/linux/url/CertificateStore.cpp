@@ -9,8 +9,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <climits>
 #include <cstdlib>
 #include <memory>
+#include <optional>
 #include <string_view>
 #include <utility>
 
@@ -41,17 +43,30 @@ std::vector<std::string> systemPlaces() {
   return places;
 }
 
-// All certificates and revocation lists of a PEM file; false when there is none, or one of them is broken.
-bool addFile(X509_STORE* store, const std::string& path) {
+// The whole of a file, or nothing when it cannot be read now.
+std::optional<std::string> contentsOf(const std::string& path) {
   // Without O_NONBLOCK a named pipe in the file's place would hold the network thread for ever.
   const int descriptor = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
-  if (descriptor < 0) return false;
-  const std::unique_ptr<BIO, Free> file(BIO_new_fd(descriptor, BIO_CLOSE));
+  if (descriptor < 0) return std::nullopt;
+  std::string contents;
   struct stat status = {};
-  if (!file) return ::close(descriptor), false;
-  if (::fstat(descriptor, &status) != 0 || !S_ISREG(status.st_mode)) return false;
+  ssize_t count = ::fstat(descriptor, &status) == 0 && S_ISREG(status.st_mode) ? 1 : -1;
+  while (count > 0) {
+    char bytes[16384];
+    count = ::read(descriptor, bytes, sizeof bytes);
+    if (count > 0) contents.append(bytes, static_cast<size_t>(count));
+  }
+  ::close(descriptor);
+  return count == 0 ? std::optional(std::move(contents)) : std::nullopt;
+}
+
+// All certificates and revocation lists of a PEM file; false when there is none, or one of them is broken.
+bool addCertificates(X509_STORE* store, const std::string& contents) {
+  const std::unique_ptr<BIO, Free> memory(
+      BIO_new_mem_buf(contents.data(), static_cast<int>(std::min<size_t>(contents.size(), INT_MAX))));
+  if (!memory) return false;
   const std::unique_ptr<STACK_OF(X509_INFO), Free> entries(
-      PEM_X509_INFO_read_bio(file.get(), nullptr, nullptr, nullptr));
+      PEM_X509_INFO_read_bio(memory.get(), nullptr, nullptr, nullptr));
   if (!entries) return false;
   int added = 0;
   for (int i = 0; i < sk_X509_INFO_num(entries.get()); ++i) {
@@ -81,12 +96,20 @@ CertificateStore::Seen CertificateStore::look(const std::string& path) {
 void CertificateStore::load() {
   std::vector<Seen> now;
   for (const std::string& path : watched_) now.push_back(look(path));
-  if (store_ != nullptr && now == read_) return;
+  if (now == read_) return;
   Store fresh(X509_STORE_new());
   if (!fresh) return;
-  const bool good =
-      file_.empty() ? X509_STORE_set_default_paths(fresh.get()) == 1 : addFile(fresh.get(), file_);
-  if (!good) return;  // being replaced, perhaps: what was read still holds
+  if (file_.empty()) {
+    if (X509_STORE_set_default_paths(fresh.get()) != 1) return;
+  } else {
+    const std::optional<std::string> contents = contentsOf(file_);
+    if (!contents) return;
+    // Being replaced, perhaps: what was read before still holds. It says the same until it changes.
+    if (!addCertificates(fresh.get(), *contents)) {
+      read_ = std::move(now);
+      return;
+    }
+  }
   // An administrator may trust an intermediate authority alone.
   X509_STORE_set_flags(fresh.get(), X509_V_FLAG_TRUSTED_FIRST | X509_V_FLAG_PARTIAL_CHAIN);
   X509_STORE_free(store_);

@@ -2,7 +2,8 @@
 // of its own for each connection would cost more memory and time than everything else about it. They are read again when
 // the certificate file has changed, or the system's file or one of its folders, so that an authority that an
 // administrator withdrew is not trusted any more. Network thread only; it never waits for what a file's name leads to
-// (a pipe), and keeps what was read before while a file cannot be read.
+// (a pipe), and keeps what was read before while a file cannot be read. A file that could be read and holds something
+// broken is not read again before it changes.
 #pragma once
 
 #include <cstdint>

@@ -1,11 +1,15 @@
 #include <curl/curl.h>
 #include <openssl/pem.h>
 #include <openssl/x509.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <memory>
 #include <set>
 
@@ -96,6 +100,58 @@ TEST_F(CurlURLSessionTLS, TakesUpAReplacedCertificateFile) {
   std::filesystem::rename(authority_.folder() + "/next.pem", authority_.file());
   const Outcome outcome = perform(*urls, get(server.url("/")));
   EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+}
+
+// How often the file has been opened since this was made.
+class Openings {
+ public:
+  explicit Openings(const std::string& file) : events_(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
+    EXPECT_GE(::inotify_add_watch(events_, file.c_str(), IN_OPEN | IN_CLOSE), 0);
+  }
+  ~Openings() { ::close(events_); }
+  Openings(const Openings&) = delete;
+  Openings& operator=(const Openings&) = delete;
+  int count() {
+    inotify_event event;  // without a name, since a file is watched
+    while (::read(events_, &event, sizeof event) > 0) count_ += (event.mask & IN_OPEN) != 0 ? 1 : 0;
+    return count_;
+  }
+
+ private:
+  const int events_;
+  int count_ = 0;
+};
+
+// The thread that reads it carries all requests.
+TEST_F(CurlURLSessionTLS, ABrokenCertificateFileIsReadOnceAndAgainWhenItHasChanged) {
+  TestHTTPServer server(with(authority_.issue()));
+  std::ifstream in(authority_.file());
+  const std::string good((std::istreambuf_iterator<char>(in)), {});
+  const auto write = [&](const std::string& text) { std::ofstream(authority_.file()) << text; };
+  const std::string broken = good + "-----BEGIN CERTIFICATE-----\nnonsense\n-----END CERTIFICATE-----\n";
+  write(broken);
+  Openings openings(authority_.file());
+  for (int i = 0; i < 5; ++i)
+    EXPECT_EQ(perform(*session(), get(server.url("/"))).errorCode(), CURLE_SSL_CACERT_BADFILE);
+  EXPECT_EQ(openings.count(), 1);
+  write(good);
+  EXPECT_EQ(perform(*session(), get(server.url("/"))).status(), 200);
+  const int before = openings.count();
+  write(broken);
+  for (int i = 0; i < 5; ++i) EXPECT_EQ(perform(*session(), get(server.url("/"))).status(), 200);
+  EXPECT_EQ(openings.count(), before + 2) << "one of them to write it";
+}
+
+// What is refused once may be granted the next time.
+TEST_F(CurlURLSessionTLS, ACertificateFileThatCouldNotBeReadIsTriedAgain) {
+  TestHTTPServer server(with(authority_.issue()));
+  const std::string away = authority_.folder() + "/away.pem";
+  std::filesystem::rename(authority_.file(), away);
+  std::filesystem::create_directory(authority_.file());
+  EXPECT_EQ(perform(*session(), get(server.url("/"))).errorCode(), CURLE_SSL_CACERT_BADFILE);
+  std::filesystem::remove(authority_.file());
+  std::filesystem::rename(away, authority_.file());
+  EXPECT_EQ(perform(*session(), get(server.url("/"))).status(), 200);
 }
 
 TEST_F(CurlURLSessionTLS, ANamedPipeInTheCertificateFilesPlaceHoldsNobody) {
