@@ -36,17 +36,30 @@ bool isPort(std::string_view text) {
   return text.empty() || (error == std::errc() && stopped == end);
 }
 
-bool isHostAndPort(std::string_view authority) {
-  if (const size_t user = authority.rfind('@'); user != authority.npos) authority.remove_prefix(user + 1);
-  if (authority.starts_with('[')) {
-    const size_t end = authority.find(']');
-    return end != authority.npos && end > 1 && isPort(authority.substr(end + 1));
-  }
-  const size_t end = std::min(authority.find(':'), authority.size());
-  return end > 0 && isPort(authority.substr(end));
+bool hasBracket(std::string_view text) {
+  return text.find_first_of("[]") != text.npos;
 }
 
-// A scheme, a host, perhaps a port, and nothing that cannot stand in an address.
+bool isHostAndPort(std::string_view authority) {
+  if (const size_t user = authority.rfind('@'); user != authority.npos) {
+    if (hasBracket(authority.substr(0, user))) return false;
+    authority.remove_prefix(user + 1);
+  }
+  if (authority.starts_with('[')) {
+    const size_t end = authority.find(']');
+    return end != authority.npos && end > 1 && !hasBracket(authority.substr(1, end - 1)) &&
+           isPort(authority.substr(end + 1));
+  }
+  const size_t end = std::min(authority.find(':'), authority.size());
+  return end > 0 && !hasBracket(authority) && isPort(authority.substr(end));
+}
+
+bool mayStandInAddress(unsigned char c) {
+  constexpr std::string_view marks = "-._~:/?#[]@!$&'()*+,;=%";
+  return c < 0x80 && (std::isalnum(c) != 0 || marks.find(static_cast<char>(c)) != marks.npos);
+}
+
+// A URL as RFC 3986 has it: a scheme, a host, perhaps a port, and nothing that cannot stand where it stands.
 bool isAddress(std::string_view url) {
   const size_t scheme = url.find("://");
   if (scheme == url.npos) return false;
@@ -55,14 +68,16 @@ bool isAddress(std::string_view url) {
   if (name != "https" && name != "http") return false;
   for (size_t i = 0; i < url.size(); ++i) {
     const auto c = static_cast<unsigned char>(url[i]);
-    if (c <= ' ' || c == 0x7f) return false;
+    if (!mayStandInAddress(c)) return false;
     const bool escapes = c == '%';
     if (escapes && (i + 2 >= url.size() || std::isxdigit(static_cast<unsigned char>(url[i + 1])) == 0 ||
                     std::isxdigit(static_cast<unsigned char>(url[i + 2])) == 0))
       return false;
   }
   const std::string_view rest = url.substr(scheme + 3);
-  return isHostAndPort(rest.substr(0, rest.find_first_of("/?#")));
+  const size_t host = std::min(rest.find_first_of("/?#"), rest.size());
+  const bool hasOneFragment = rest.find('#') == rest.rfind('#');
+  return isHostAndPort(rest.substr(0, host)) && !hasBracket(rest.substr(host)) && hasOneFragment;
 }
 
 }  // namespace

@@ -275,10 +275,38 @@ TEST_F(Upload, AFileThatCannotBeCompressedIsRefused) {
 }
 
 TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
-  for (const char* url :
-       {"", "upload.example.org", "ftp://x/", "https://", "https:///in", "https://?a", "http://a b/",
-        "http://a\x7f/", "://a/", "https://a:70000/", "https://a:in/", "https://user@/in", "https://[::1",
-        "https://[]/", "https://:443/", "https://a/%", "https://a/%4", "https://a/%zz"}) {
+  for (const char* url : {"",
+                          "upload.example.org",
+                          "ftp://x/",
+                          "https://",
+                          "https:///in",
+                          "https://?a",
+                          "http://a b/",
+                          "http://a\x7f/",
+                          "://a/",
+                          "https://a:70000/",
+                          "https://a:in/",
+                          "https://user@/in",
+                          "https://[::1",
+                          "https://[]/",
+                          "https://:443/",
+                          "https://a/%",
+                          "https://a/%4",
+                          "https://a/%zz",
+                          "https://a/\xc3\xbc",
+                          "https://a/<in>",
+                          "https://a/\"in\"",
+                          "https://a/{in}",
+                          "https://a/in|out",
+                          "https://a\\in",
+                          "https://a/^",
+                          "https://a/`",
+                          "https://a/[in]",
+                          "https://a[1]/",
+                          "https://[::1]]/",
+                          "https://[[::1]/",
+                          "https://[u]@a/",
+                          "https://a/#in#out"}) {
     backend_ = nullptr;
     platform_.sink.clear();
     profile_.set("post_url", url);
@@ -292,13 +320,14 @@ TEST_F(Upload, AnAddressThatIsNoneMakesNoRequest) {
 // Not what "post_url" says alone.
 TEST_F(Upload, TheFinishedAddressIsJudged) {
   for (const char* url : {"https://upload.example.org", "https://a:/in", "https://[2001:db8::1]:8443/in",
-                          "https://user:word@a:443", "https://a/x%20y"}) {
+                          "https://user:word@a:443", "https://a/x%20y", "https://a/-._~!$&'()*+,;=:@",
+                          "https://user:word@[::1]:443/", "https://a/in#part"}) {
     backend_ = nullptr;
     platform_.sink.clear();
     profile_.set("post_url", url);
     EXPECT_TRUE(upload()) << url;
   }
-  EXPECT_EQ(poster_->requests.size(), 5u);
+  EXPECT_EQ(poster_->requests.size(), 8u);
 }
 
 // What stands behind a "post_url" that is an address by itself.
