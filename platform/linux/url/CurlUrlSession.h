@@ -10,7 +10,9 @@
 // option forbids that. It goes again only where the server's TCP has acknowledged not a byte of it (UrlConnection.h), on
 // a new connection and three times at most; GET and HEAD, which change nothing, go again as libcurl likes. A kept
 // connection is looked at before it is used: whether its server has ended it, and, when the kernel has announced a
-// change of routes or addresses, whether a new one would leave the same way.
+// change of routes or addresses or cannot tell, whether a new one would leave the same way. Where none of them would, what
+// has not begun starts anew. Over HTTP/2 a request that has ended unheard goes again only when its connection owes no
+// answer to others, since that is broken off before.
 //
 // In sessions that wait for connectivity a request without a route, or whose server's name cannot be looked
 // up because no name server has a route, is set aside until the kernel announces a change (or, as a second

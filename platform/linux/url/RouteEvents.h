@@ -13,7 +13,7 @@ class RouteEvents {
   RouteEvents& operator=(const RouteEvents&) = delete;
 
   // Whether there is a subscription now. Without one (no descriptors, a confinement that forbids it) the slow
-  // timer is all that wakes what waits.
+  // timer is all that wakes what waits, and each request looks at its session's connections.
   bool subscribe();
   void unsubscribe();
   [[nodiscard]] int descriptor() const { return socket_; }  // readable after an event; -1: not subscribed

@@ -62,6 +62,12 @@ std::optional<Figures> figuresOf(int socket) {
   return Figures{info.tcpi_state, info.tcpi_bytes_acked};
 }
 
+bool isUnspecified(const sockaddr_storage& address) {
+  if (address.ss_family == AF_INET)
+    return reinterpret_cast<const sockaddr_in&>(address).sin_addr.s_addr == INADDR_ANY;
+  return IN6_IS_ADDR_UNSPECIFIED(&reinterpret_cast<const sockaddr_in6&>(address).sin6_addr);
+}
+
 // Whether the address is one of this machine's.
 bool isHere(sockaddr_storage address) {
   if (address.ss_family == AF_INET) reinterpret_cast<sockaddr_in&>(address).sin_port = 0;
@@ -77,13 +83,13 @@ bool isHere(sockaddr_storage address) {
 
 bool URLConnection::isBetween(const char* local, int localPort, const char* peer, int peerPort) {
   if (isOver_) return false;
-  if (!connected_) {
-    local_ = nameOf(socket_, ::getsockname);
-    peer_ = nameOf(socket_, ::getpeername);
-  }
-  const bool is = isAddress(local_, local, localPort) && isAddress(peer_, peer, peerPort);
-  connected_ = connected_ || is;
-  return is;
+  if (connected_) return isAddress(local_, local, localPort) && isAddress(peer_, peer, peerPort);
+  const sockaddr_storage here = nameOf(socket_, ::getsockname), there = nameOf(socket_, ::getpeername);
+  connected_ = isAddress(here, local, localPort) && isAddress(there, peer, peerPort);
+  if (!connected_) return false;
+  local_ = here;
+  peer_ = there;
+  return true;
 }
 
 // Its number may be another's by now.
@@ -167,8 +173,11 @@ void URLConnection::closing() {
 }
 
 RouteTable::Way URLConnection::way(RouteTable& routes, bool avoidCellular) const {
-  if (!isHere(local_)) return RouteTable::Way::none;
-  return routes.wayOf(generic(local_), generic(peer_), interface_, avoidCellular);
+  const sockaddr_storage local = connected_ ? local_ : nameOf(socket_, ::getsockname);
+  // Closed by libcurl without a word, or its number is another's by now: not in the way of anything.
+  if (local.ss_family != peer_.ss_family || isUnspecified(local)) return RouteTable::Way::same;
+  if (!isHere(local)) return RouteTable::Way::none;
+  return routes.wayOf(generic(local), generic(peer_), interface_, avoidCellular);
 }
 
 }  // namespace kyt

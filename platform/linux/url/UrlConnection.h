@@ -28,8 +28,9 @@ class URLTransfer;
 
 class URLConnection {
  public:
-  // `interface`: that it is bound to; empty: to none.
-  URLConnection(int socket, std::string interface) : socket_(socket), interface_(std::move(interface)) {}
+  // `interface`: that it is bound to; empty: to none. `peer`: that it is to lead to.
+  URLConnection(int socket, std::string interface, const sockaddr_storage& peer)
+      : socket_(socket), interface_(std::move(interface)), peer_(peer) {}
 
   [[nodiscard]] int socket() const { return socket_; }
   // Whether it is the one between these addresses; once it was, it stays so until it is closed.
@@ -56,7 +57,7 @@ class URLConnection {
   void abortWhatIsLeft();
   // The last look, before the socket is closed; what has not arrived of a request that may go again is thrown away.
   void closing();
-  // How a connection made now would leave; none also when this end's address is gone.
+  // How a connection made now would leave; none also when this end's address is gone. Of one that is being made too.
   [[nodiscard]] RouteTable::Way way(RouteTable& routes, bool avoidCellular) const;
 
   bool isSilent = false;                // known to be HTTP/1.1: its server says nothing without being asked
@@ -75,7 +76,7 @@ class URLConnection {
   bool peerEnded_ = false;
   uint64_t acknowledged_ = 0;
   const std::string interface_;
-  sockaddr_storage local_{}, peer_{};
+  sockaddr_storage local_{}, peer_;
 };
 
 }  // namespace kyt

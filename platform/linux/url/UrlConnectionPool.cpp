@@ -158,9 +158,9 @@ void URLConnectionPool::retire() {
   isRetired_ = true;
 }
 
-void URLConnectionPool::opened(int socket, std::string interface) {
+void URLConnectionPool::opened(int socket, std::string interface, const sockaddr_storage& peer) {
   std::erase_if(connections_, [&](const auto& one) { return one->socket() == socket; });
-  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface)));
+  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface), peer));
 }
 
 std::shared_ptr<URLConnection> URLConnectionPool::connectionBetween(const char* local, int localPort,
@@ -183,12 +183,9 @@ bool URLConnectionPool::judgeConnections() {
   bool good = true;
   routesWhenJudged = network_.routeChanges();
   for (const auto& one : connections_) {
-    if (!one->isConnected()) {  // nobody knows from where it is on its way
-      good = false;
-      continue;
-    }
     const RouteTable::Way way = one->way(network_.routes(), number_ == 1);
     good = good && way == RouteTable::Way::same;
+    if (!one->isConnected()) continue;  // nothing has begun on it
     if (way != RouteTable::Way::none) {
       one->lostSince.reset();
     } else if (!one->lostSince) {

@@ -32,16 +32,19 @@ class URLConnectionPool {
   [[nodiscard]] CURLcode add(URLTransfer& transfer);
   void remove(URLTransfer& transfer);  // whether it has ended or not
   void socketReady(int socket, uint32_t events);
-  // A socket for a connection of this pool; `interface`: that it is bound to.
-  void opened(int socket, std::string interface);
+  // A socket for a connection of this pool to `peer`; `interface`: that it is bound to.
+  void opened(int socket, std::string interface, const sockaddr_storage& peer);
   // The one between these addresses, or null.
   [[nodiscard]] std::shared_ptr<URLConnection> connectionBetween(const char* local, int localPort,
                                                                  const char* peer, int peerPort);
   // Looks where its connections lead. Whether a new request may go on any of them: none would leave otherwise when
   // it were made now.
   [[nodiscard]] bool judgeConnections();
-  // No new request: it ends with its last one. Its owner is the network from then on.
+  // No new request: it ends with its last one. Its owner is the network from then on, which takes those out of it
+  // that have not begun.
   void retire();
+  bool isSearched = false;  // for those
+  [[nodiscard]] URLSessionState& session() { return session_; }
   [[nodiscard]] bool isEmpty() const { return active_ == 0; }
   uint64_t routesWhenJudged = 0;  // the number of their last change
   // Frees itself from the event loop, soon, when nothing is in it.

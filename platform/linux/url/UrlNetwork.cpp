@@ -205,6 +205,7 @@ void URLNetwork::run() {
     const bool ends = cancelled_.load();  // before what is there is cancelled, or some of it might be left
     cancelWhatIsUnwanted();
     activateNextInLine();
+    emptyRetiredPools();
     endRetiredPools();
     if (ends) {
       MutexLock lock(mutex_);

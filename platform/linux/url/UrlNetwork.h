@@ -125,12 +125,15 @@ class URLNetwork {
   [[nodiscard]] URLConnectionPool& poolFor(URLTransfer& transfer);
   void failWith(URLTransfer& transfer, CURLcode code);
   [[nodiscard]] bool goAgainOrWait(URLTransfer& transfer);
+  void ended(URLTransfer& transfer, CURLcode code, long systemError);
+  void endOthersThatMay(const URLConnection& connection);
   void stuck(URLTransfer& transfer);
   void lookAtLostConnection(URLTransfer& transfer);
   void noteRouteChanges();
   void judgeConnections();
   void retire(std::unique_ptr<URLConnectionPool>& pool);
   void retirePoolOf(const URLTransfer& transfer);
+  void emptyRetiredPools();
   void endRetiredPools();
 
   // Waiting for connectivity (UrlNetworkWaiting.cpp).
@@ -171,6 +174,7 @@ class URLNetwork {
   IdlePools idlePools_;
   RouteTable routes_;
   RouteEvents routeEvents_;
+  bool isDeaf_ = false;  // there could be no subscription: nobody told of the last changes
   uint64_t routeChanges_ = 0;
   CertificateStore certificates_;
   std::optional<CurlLibrary> curl_;

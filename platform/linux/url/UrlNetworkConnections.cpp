@@ -23,6 +23,10 @@ URLConnectionPool& URLNetwork::poolFor(URLTransfer& transfer) {
   URLSessionState& session = *transfer.session;
   std::unique_ptr<URLConnectionPool>& pool = session.pools[transfer.request.allowsCellularAccess ? 0 : 1];
   if (routeEvents_.takeAll()) noteRouteChanges();
+  if (isDeaf_) {
+    ++routeChanges_;  // for all that is known
+    listenForRoutes();
+  }
   if (pool && pool->routesWhenJudged != routeChanges_ && !pool->judgeConnections()) retire(pool);
   if (!pool) {
     pool = std::make_unique<URLConnectionPool>(*this, session, &pool - session.pools);
@@ -63,18 +67,40 @@ void URLNetwork::transferEnded(URLTransfer& transfer, CURLcode code) {
     activate(transfer);
     return;
   }
-  const bool unheard = code != CURLE_OK && transfer.hasBegun && transfer.isUnheard();
-  withdraw(transfer);
-  if (code == CURLE_OK) {
+  if (code != CURLE_OK) {
+    ended(transfer, code, systemError);
+  } else {
+    withdraw(transfer);
     transfer.takeReply(static_cast<int>(status));
     completed_.fetch_add(1, std::memory_order_relaxed);
     finish(transfer);
+  }
+  if (connection) endOthersThatMay(*connection);
+}
+
+// One that the server does not have may go again only when nothing of it can arrive any more, so when its connection is
+// broken off. That waits for the answers to others.
+void URLNetwork::ended(URLTransfer& transfer, CURLcode code, long systemError) {
+  const bool unheard = transfer.hasBegun && transfer.isUnheard();
+  if (unheard && transfer.sharesItsConnection()) {
+    transfer.endedWith = code;
+    connectionLost(transfer);
     return;
   }
+  const std::shared_ptr<URLConnection> connection = transfer.connection;
+  withdraw(transfer);
   if (unheard) connection->abortWhatIsLeft();
   if (unheard ? goAgainOrWait(transfer) : !transfer.hasBegun && retryOrWait(transfer, code, systemError))
     return;
   failWith(transfer, code);
+}
+
+void URLNetwork::endOthersThatMay(const URLConnection& connection) {
+  for (URLTransfer* other : connection.transfers) {
+    if (!other->endedWith) continue;
+    other->lostLook = now_;
+    armDeadline(*other);
+  }
 }
 
 void URLNetwork::failWith(URLTransfer& transfer, CURLcode code) {
@@ -101,7 +127,7 @@ bool URLNetwork::goAgainOrWait(URLTransfer& transfer) {
 
 // The connection may be dead, so nothing more begins on it.
 void URLNetwork::stuck(URLTransfer& transfer) {
-  const bool unheard = transfer.hasBegun && transfer.isUnheard();
+  const bool unheard = transfer.hasBegun && transfer.isUnheard() && !transfer.sharesItsConnection();
   const std::shared_ptr<URLConnection> connection = transfer.connection;
   retirePoolOf(transfer);
   if (unheard) connection->abort();
@@ -120,6 +146,10 @@ void URLNetwork::connectionLost(URLTransfer& transfer) {
 // Others on the same connection of which the server has something would lose their answers: those have until they are
 // stuck, in case the way comes back.
 void URLNetwork::lookAtLostConnection(URLTransfer& transfer) {
+  if (transfer.endedWith) {
+    ended(transfer, *transfer.endedWith, 0);
+    return;
+  }
   const std::shared_ptr<URLConnection> connection = transfer.connection;
   const bool isLost = connection && connection->lostSince;
   const bool goesBack = isLost && std::all_of(connection->transfers.begin(), connection->transfers.end(),
@@ -164,6 +194,23 @@ void URLNetwork::retire(std::unique_ptr<URLConnectionPool>& pool) {
 void URLNetwork::retirePoolOf(const URLTransfer& transfer) {
   for (auto& pool : transfer.session->pools)
     if (pool && pool.get() == transfer.pool) retire(pool);
+}
+
+// What has not begun there would begin on a connection that is dead, or wait for one.
+void URLNetwork::emptyRetiredPools() {
+  for (size_t i = 0; i < retired_.size(); ++i) {  // there may be more
+    URLConnectionPool& pool = *retired_[i];
+    if (pool.isEmpty() || std::exchange(pool.isSearched, true)) continue;
+    const std::shared_ptr<URLSessionState> kept = pool.session().self;
+    for (URLTransfer* transfer = kept->transfers.first(); transfer != nullptr;) {
+      URLTransfer* next = transfer->links.next;
+      if (transfer->pool == &pool && !transfer->hasBegun) {
+        withdraw(*transfer);
+        activate(*transfer);
+      }
+      transfer = next;
+    }
+  }
 }
 
 // Not sooner: whoever retires one may have been called by it.

@@ -115,12 +115,15 @@ void URLNetwork::stopWaiting(URLTransfer& transfer) {
 
 void URLNetwork::listenForRoutes() {
   if (!slowRetry_.isSet()) slowRetry_.set(now_ + options_.waitingRetryPeriod);
-  if (routeEvents_.descriptor() >= 0 || !routeEvents_.subscribe()) return;
+  if (routeEvents_.descriptor() >= 0) return;
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.u64 = kRoutes;
-  // Otherwise again with the next request that waits; the slow timer runs anyway.
-  if (epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event) != 0) routeEvents_.unsubscribe();
+  const bool hears =
+      routeEvents_.subscribe() && epoll_ctl(epoll_, EPOLL_CTL_ADD, routeEvents_.descriptor(), &event) == 0;
+  // Otherwise again with the next request; until then each of them, and the slow timer, looks by itself.
+  if (!hears) routeEvents_.unsubscribe();
+  if (std::exchange(isDeaf_, !hears) && hears) noteRouteChanges();
 }
 
 void URLNetwork::waitingTimer() {
@@ -129,6 +132,7 @@ void URLNetwork::waitingTimer() {
     return;
   }
   slowRetry_.set(now_ + options_.waitingRetryPeriod);
+  if (isDeaf_) noteRouteChanges();
   retryWaiting(true);
 }
 

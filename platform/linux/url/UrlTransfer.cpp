@@ -99,12 +99,20 @@ void URLTransfer::clearReply() {
   addresses.clear();
   onlyCellularRoutes = replyTooLong = false;
   hasBegun = wasToBeRepeated = foundEndedConnection = false;
+  endedWith.reset();
   leaveConnection();
   connection.reset();
 }
 
 bool URLTransfer::isUnheard() {
   return connection != nullptr && connection->hasAcknowledgedNothingBehind(mark);
+}
+
+bool URLTransfer::sharesItsConnection() const {
+  return connection != nullptr &&
+         std::any_of(connection->transfers.begin(), connection->transfers.end(), [this](URLTransfer* other) {
+           return other != this && !other->endedWith && !other->isUnheard();
+         });
 }
 
 void URLTransfer::leaveConnection() {
@@ -259,8 +267,10 @@ curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockadd
   URLNetwork& network = *self.session->network;
   self.wasToBeRepeated = self.hasBegun && !self.mayBeRepeated();
   if (self.wasToBeRepeated) return CURL_SOCKET_BAD;
-  if (self.addresses.size() < kMaxAddresses && address->addrlen <= sizeof(sockaddr_storage))
-    std::memcpy(&self.addresses.emplace_back(), &address->addr, address->addrlen);
+  sockaddr_storage peer{};
+  if (address->addrlen > sizeof peer) return CURL_SOCKET_BAD;
+  std::memcpy(&peer, &address->addr, address->addrlen);
+  if (self.addresses.size() < kMaxAddresses) self.addresses.push_back(peer);
 
   std::string interface;
   if (!self.request.allowsCellularAccess) {
@@ -281,7 +291,7 @@ curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockadd
     (void)setsockopt(opened, SOL_SOCKET, SO_BINDTODEVICE, interface.c_str(),
                      static_cast<socklen_t>(interface.size() + 1));
   network.sockets().opened(opened);
-  self.pool->opened(opened, std::move(interface));
+  self.pool->opened(opened, std::move(interface), peer);
   return opened;
 }
 

@@ -41,6 +41,9 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   void clearReply();
   // Whether the peer's TCP is known to have acknowledged not a byte of it. Of one that has begun.
   [[nodiscard]] bool isUnheard();
+  // Whether the server has something of another request on its connection, so that breaking that off would lose an
+  // answer.
+  [[nodiscard]] bool sharesItsConnection() const;
   // It is on its way on no connection any more; what is known of the one it was on stays.
   void leaveConnection();
   // Of the request's headers, once it has been configured.
@@ -60,8 +63,11 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   bool hasBegun = false;            // it was handed to a connection, which may have sent some of it
   bool wasToBeRepeated = false;     // libcurl was about to send it again, and was not let
   bool foundEndedConnection =
-      false;                 // the kept connection chosen for it was none any more, so it has not begun
-  Links<URLTransfer> links;  // among its session's
+      false;  // the kept connection chosen for it was none any more, so it has not begun
+  // libcurl has ended it, and what becomes of it is not decided: the server may not have it, and others need the answers
+  // that its connection still brings.
+  std::optional<CURLcode> endedWith;
+  Links<URLTransfer> links;                   // among its session's
   Links<URLTransfer> waitingLinks;            // those of its user that wait, while it waits
   std::shared_ptr<URLTransfer> self;          // keeps it alive while the network thread has it
   CURL* handle = nullptr;                     // while active

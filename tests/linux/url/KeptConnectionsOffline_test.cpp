@@ -1,13 +1,31 @@
 // What becomes of requests on a session's kept connections when the network goes away and comes back while the server
 // knows nothing of it: they wait, and arrive once.
 #include <curl/curl.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
+#include <atomic>
+#include <cerrno>
 #include <fstream>
 #include <sstream>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 #include "tests/linux/url/Http2Nginx.h"
 #include "tests/support/NetworkNamespace.h"
+
+namespace {
+std::atomic<bool> subscriptionsFail{false};
+}
+
+// In place of the C library's: what asks the kernel for its route events does not wait, what asks for a route does.
+extern "C" int socket(int family, int type, int protocol) {
+  if (subscriptionsFail && family == AF_NETLINK && (type & SOCK_NONBLOCK) != 0) {
+    errno = EMFILE;
+    return -1;
+  }
+  return static_cast<int>(syscall(SYS_socket, family, type, protocol));
+}
 
 namespace kyt {
 namespace {
@@ -78,6 +96,17 @@ class KeptConnectionsOffline : public CurlURLSessionFixture, public testing::Wit
     return false;
   }
   static bool isConnecting() { return anyConnection("02", false); }
+  // The local addresses of those that are.
+  static std::string connecting() {
+    std::string all;
+    for (const char* table : {"/proc/thread-self/net/tcp", "/proc/thread-self/net/tcp6"}) {
+      std::ifstream file(table);
+      std::string number, local, peer, is;
+      for (std::string line; std::getline(file, line);)
+        if (std::istringstream(line) >> number >> local >> peer >> is && is == "02") all += local + " ";
+    }
+    return all;
+  }
   static bool hasUnacknowledged() { return anyConnection("01", true); }
   size_t times(const std::string& body) {
     size_t count = 0;
@@ -200,6 +229,152 @@ TEST_P(KeptConnectionsOffline, WhatIsStuckAndMayHaveArrivedIsReported) {
   server_->setReply({});
   EXPECT_EQ(perform(*urls, post(server_->url("/"), "next")).status(), 200);
   EXPECT_EQ(server_->connectionsAccepted(), 2u) << "nothing more goes on a connection that is stuck";
+}
+
+// How soon is meant by "at once" here: a connection that leads nowhere is given up after 30 s, a request that makes no
+// progress after 60.
+constexpr auto kSoon = 15s;
+
+TEST_P(KeptConnectionsOffline, WhatWasAboutToConnectWhenTheRouteWentWaits) {
+  ASSERT_TRUE(breakTheWay());
+  auto urls = session(true);
+  Outcome outcome;
+  urls->start(post(server_->url("/"), "x"), outcome.completion());
+  ASSERT_TRUE(eventually([&] { return isConnecting(); }));
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_TRUE(goAway());
+  ASSERT_TRUE(waitUntilWaiting(1));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  ASSERT_TRUE(mendTheWay() && comeBack());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_EQ(times("x"), 1u);
+}
+
+TEST_P(KeptConnectionsOffline, WhatWasAboutToConnectFromAFormerAddressConnectsFromTheNewOne) {
+  ASSERT_TRUE(breakTheWay());
+  auto urls = session(true);
+  std::vector<Outcome> outcomes(3);
+  for (Outcome& outcome : outcomes) urls->start(post(server_->url("/"), "x"), outcome.completion());
+  ASSERT_TRUE(eventually([&] { return isConnecting(); }));
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_TRUE(move() && mendTheWay());
+  for (Outcome& outcome : outcomes) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  }
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  EXPECT_EQ(times("x"), 3u);
+  EXPECT_EQ(server_->requests().back().peer, family().other);
+}
+
+TEST_P(KeptConnectionsOffline, WhatIsAboutToConnectIsNotDisturbedByChangesElsewhere) {
+  ASSERT_TRUE(breakTheWay());
+  auto urls = session(true);
+  Outcome outcome;
+  urls->start(post(server_->url("/"), "x"), outcome.completion());
+  ASSERT_TRUE(eventually([&] { return isConnecting(); }));
+  const std::string before = connecting();
+  for (int i = 0; i < 5; ++i) {
+    ASSERT_TRUE(here_->run("ip addr add 10.90.0.1/32 dev lo && ip addr del 10.90.0.1/32 dev lo"));
+    // By now the network thread has taken up the changes, or it does so in the next round.
+    EXPECT_FALSE(outcome.wait(100ms));
+  }
+  EXPECT_EQ(connecting(), before);
+  ASSERT_TRUE(mendTheWay());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+}
+
+// A session has eight connections to one server at most.
+TEST_P(KeptConnectionsOffline, WhatHadNoConnectionYetDoesNotWaitForThoseOfAFormerAddress) {
+  server_->setHandler([](const TestHTTPServer::Request& request) {
+    TestHTTPServer::Reply reply;
+    if (request.body == "held") reply.behaviour = Behaviour::hold;
+    return reply;
+  });
+  auto urls = session(true);
+  std::vector<Outcome> held(8), next(2);
+  for (Outcome& outcome : held) urls->start(post(server_->url("/"), "held"), outcome.completion());
+  ASSERT_TRUE(server_->waitForRequests(8));
+  for (Outcome& outcome : next) urls->start(post(server_->url("/"), "next"), outcome.completion());
+  EXPECT_FALSE(next[0].wait(200ms));
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_TRUE(move());
+  for (Outcome& outcome : next) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  }
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  EXPECT_EQ(times("held"), 8u);
+  EXPECT_EQ(times("next"), 2u);
+}
+
+// The kernel's events cannot be had: too many descriptors are open, say.
+class KeptConnectionsUntold : public KeptConnectionsOffline {
+ protected:
+  void SetUp() override {
+    subscriptionsFail = true;
+    KeptConnectionsOffline::SetUp();
+  }
+  void TearDown() override {
+    subscriptionsFail = false;
+    KeptConnectionsOffline::TearDown();
+  }
+};
+
+INSTANTIATE_TEST_SUITE_P(Families, KeptConnectionsUntold, testing::Values(kFour, kSix),
+                         [](const auto& family) { return std::string(family.param.name); });
+
+TEST_P(KeptConnectionsUntold, NothingGoesOnTheConnectionOfAFormerAddress) {
+  auto urls = session(true);
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(move());
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "after")).status(), 200);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  EXPECT_EQ(server_->requests().back().peer, family().other);
+}
+
+TEST_P(KeptConnectionsUntold, WhatIsOnItsWayIsLookedAtByTheSlowTimer) {
+  options_.waitingRetryPeriod = 1s;
+  auto urls = session(true);
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(breakTheWay());
+  Outcome outcome;
+  urls->start(post(server_->url("/"), "lost"), outcome.completion());
+  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_TRUE(goAway());
+  ASSERT_TRUE(waitUntilWaiting(1));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  ASSERT_TRUE(mendTheWay() && comeBack());
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_EQ(times("lost"), 1u);
+}
+
+TEST_P(KeptConnectionsUntold, OnceTheKernelCanTellWhatHappenedMeanwhileIsLookedAt) {
+  // Or the kernel would tell of these addresses in the middle of it.
+  ASSERT_TRUE(eventually([&] { return !here_->run("ip -6 address show tentative | grep -q ."); }));
+  auto urls = session(true);
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(breakTheWay());
+  Outcome lost;
+  urls->start(post(server_->url("/"), "lost"), lost.completion());
+  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  ASSERT_TRUE(goAway());
+  subscriptionsFail = false;
+  auto others = session(true);
+  const std::string next = family().there;
+  Outcome other;  // that is on its way for long enough
+  others->start(post("http://" + (prefix_ == "/24" ? next : "[" + next + "]") + ":9/", "other"),
+                other.completion());
+  ASSERT_TRUE(waitUntilWaiting(1));
+  ASSERT_TRUE(mendTheWay() && comeBack());
+  ASSERT_TRUE(lost.wait());
+  EXPECT_EQ(lost.status(), 200) << lost.errorText();
+  EXPECT_EQ(times("lost"), 1u);
 }
 
 // HTTP/2: what a session posts shares one connection.
