@@ -33,6 +33,7 @@ int sessionCommand(const ConnectionOptions& connection, const std::string& path)
     if (const int status = script.run(*dictionary); status != 0) return status;
     std::fflush(stdout);
   }
+  script.end();
   return 0;
 }
 

@@ -122,6 +122,12 @@ int SessionScript::run(const Dictionary& step) {
   return (this->*found->second.run)(step);
 }
 
+void SessionScript::end() const {
+  if (unfinished_)
+    std::fprintf(stderr,
+                 "kytctl: session: the script ends without \"finish\": what was sent last may be lost\n");
+}
+
 int SessionScript::open(const Dictionary& step) {
   KYTReporting::Options options;
   options.socketPath = socketPath(connection_);
@@ -148,7 +154,9 @@ int SessionScript::open(const Dictionary& step) {
 
 int SessionScript::reportCall(const std::shared_ptr<Answer>& answer, const std::string& what) {
   refusal_->answers(answer);
-  return report(answer, connection_, what);
+  const int status = report(answer, connection_, what);
+  if (status == 0) unfinished_ = false;  // the daemon has taken what came before
+  return status;
 }
 
 int SessionScript::wait(const Dictionary& step) {
@@ -191,6 +199,7 @@ int SessionScript::send(const Dictionary& step) {
       return failedCall(connection_, "send", refusal_->why().value_or("the queue stays full"));
     if (!session_->sendMessage(category, type, payload, flag))
       return failed("send: the message does not fit into the queue");
+    unfinished_ = true;
   }
   return 0;
 }
@@ -250,6 +259,7 @@ int SessionScript::digestKey(const Dictionary& step) {
 int SessionScript::finish(const Dictionary&) {
   const auto timeout = std::chrono::milliseconds(static_cast<int64_t>(connection_.timeoutSeconds * 1000));
   const bool done = session_->finish(timeout);
+  unfinished_ = false;
   const KYTReporting::Statistics figures = session_->statistics();
   std::printf("sent %llu, lost %llu, dropped %llu\n",
               static_cast<unsigned long long>(figures.sent + answered_),

@@ -20,6 +20,8 @@ class SessionScript {
 
   // Runs one step and waits for its answer: 0, or 1 with a line on standard error.
   [[nodiscard]] int run(const Dictionary& step);
+  // No more steps. Says so, where messages were sent and neither "finish" nor an answer came after them.
+  void end() const;
 
  private:
   class Aggregated;
@@ -50,6 +52,7 @@ class SessionScript {
   std::shared_ptr<Refusal> refusal_;              // of the session; likewise
   uint64_t answered_ = 0;                         // messages that were sent with a reply, and got one
   bool configured_ = false;                       // what is sent before is dropped by the daemon
+  bool unfinished_ = false;                       // the daemon may not have taken what was sent
   std::unique_ptr<KYTReporting> session_;
 };
 
