@@ -2,6 +2,7 @@
 // stands beside its code. What passes one is refused or dropped, counted (platform/Counters.h) and logged once a minute.
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <optional>
@@ -59,10 +60,13 @@ struct Limits {
       32768;  // what a connection and its session count, before they hold anything
   static constexpr size_t socketBytes =
       212992;  // … and more, while its client lets the socket's buffer be full
-  static constexpr size_t freeBytes = 4096;         // what each may hold besides: counted with the connection
-  static constexpr unsigned turnCalls = 256;        // a connection hands its worker back after so many calls
-  static constexpr size_t turnBytes = 1u << 20;     // … or so many bytes
-  static constexpr size_t maxLogLineBytes = 16384;  // what clients and servers sent is shown in them
+  static constexpr size_t freeBytes = 4096;      // what each may hold besides: counted with the connection
+  static constexpr unsigned turnCalls = 256;     // a connection hands its worker back after so many calls
+  static constexpr size_t turnBytes = 1u << 20;  // … or so many bytes
+  // … or so much time, looked at after every so many calls: other clients' calls wait behind it.
+  static constexpr std::chrono::microseconds turnTime{200};
+  static constexpr unsigned turnTimeCalls = 16;
+  static constexpr size_t maxLogLineBytes = 16384;       // what clients and servers sent is shown in them
   static constexpr size_t maxQueuedLogBytes = 1u << 20;  // lines that wait for whoever reads the log
   // Power-log events that wait for a journal that is slow or stopped.
   static constexpr size_t maxQueuedPowerLogBytes = 1u << 20;

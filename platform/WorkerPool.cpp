@@ -16,6 +16,7 @@
 #include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
+#include "platform/OwnerLines.h"
 #include "platform/SerialQueue.h"
 #include "platform/SpinPause.h"
 
@@ -87,7 +88,7 @@ class WorkerPool::Implementation {
   std::vector<std::unique_ptr<Worker>> slots_
       GUARDED_BY(mutex_);                         // those of workers that ended are used again
   std::vector<Worker*> idle_ GUARDED_BY(mutex_);  // asleep; the last one is woken first
-  Queues ready_ GUARDED_BY(mutex_);
+  OwnerLines ready_ GUARDED_BY(mutex_);
   std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their half
   ConditionVariable allEnded_;
   std::thread ended_ GUARDED_BY(mutex_);  // the last worker that ended; the next to end joins it
@@ -111,7 +112,7 @@ void WorkerPool::Implementation::submit(std::shared_ptr<SerialQueue> queue) {
     if (!stopping_) {
       // A queue that its own worker submits has just been left with work: that worker looks for work next.
       const bool looksNext = Worker::current != nullptr && Worker::current->queue == queue.get();
-      ready_.push_back(std::move(queue));
+      ready_.push(std::move(queue));
       if (!looksNext) toWake = workerToWake();
       stranded = nobodyComes() && insists_;
     }
@@ -265,9 +266,7 @@ bool WorkerPool::Implementation::hasWorkAfterQuiet() {
 }
 
 std::shared_ptr<SerialQueue> WorkerPool::Implementation::take(Worker& self) {
-  while (!ready_.empty()) {
-    std::shared_ptr<SerialQueue> queue = std::move(ready_.front());
-    ready_.pop_front();
+  while (std::shared_ptr<SerialQueue> queue = ready_.pop()) {
     if (ownerMayRun(queue->owner())) {
       self.owner = queue->owner();
       return queue;
@@ -291,7 +290,7 @@ void WorkerPool::Implementation::release(Worker& self) {
   if (owner == 0 || parked_.empty()) return;
   const auto found = parked_.find(owner);
   if (found == parked_.end()) return;
-  ready_.push_front(std::move(found->second.front()));
+  ready_.pushFirst(std::move(found->second.front()));
   found->second.pop_front();
   if (found->second.empty()) parked_.erase(found);
 }
@@ -348,7 +347,7 @@ bool WorkerPool::Implementation::shutDown(MonotonicTime end) {
   }
   for (Worker* worker : sleepers) worker->wake.notifyOne();
   std::thread last;
-  Queues pending;
+  std::vector<std::shared_ptr<SerialQueue>> pending;
   {
     MutexLock lock(mutex_);
     while (workers_ > 0 || borrowed_ > 0) {
@@ -358,7 +357,7 @@ bool WorkerPool::Implementation::shutDown(MonotonicTime end) {
         return false;
     }
     last = std::move(ended_);
-    pending.swap(ready_);
+    pending = ready_.takeAll();
     for (auto& [owner, queues] : parked_)
       pending.insert(pending.end(), std::make_move_iterator(queues.begin()),
                      std::make_move_iterator(queues.end()));

@@ -6,7 +6,8 @@
 // work past that waits, counted. Idle workers end after a while, the last one too, so an idle daemon has no
 // wake-ups.
 //
-// Queues run in the order of their submission. A submission wakes a worker only when fewer than `runnable`
+// The queues of one owner run in the order of their submission, and the owners take turns: whoever has made many queues
+// ready holds up his own (OwnerLines.h). A submission wakes a worker only when fewer than `runnable`
 // run and none of them is just about to look for work; a worker that takes one queue and leaves others wakes
 // the next. A worker that the system refuses to start is tried again with the next submission.
 #pragma once

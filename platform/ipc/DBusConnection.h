@@ -2,8 +2,8 @@
 //
 // It belongs to its serial queue (owner: the peer's user and one). The reactor reports once that there is
 // something to read; then a turn on the queue reads large blocks into a lent buffer, handles each call,
-// gathers the replies for one write and asks the reactor again. A turn ends after 256 calls or 1 MiB and
-// stands in line again. What follows the last whole message is kept until more comes; an idle connection
+// gathers the replies for one write and asks the reactor again. A turn ends after 256 calls, 1 MiB or 0.2
+// milliseconds and stands in line again. What follows the last whole message is kept until more comes; an idle connection
 // keeps nothing.
 //
 // The end has one road: the session's handlers run, what waits is written, the watch ends, the descriptor is
@@ -70,12 +70,15 @@ class DBusConnection final : public Connection,
     stopped   // this side ends the connection
   };
   struct Progress {
+    MonotonicTime begin;
     unsigned calls = 0;
     size_t bytes = 0;
+    bool over = false;  // the turn has had its share
     HeaderMemory header;
   };
 
   void turn();
+  void countCall(Progress& progress) const;
   Step runSteps(Progress& progress);
   Step step(std::span<std::byte> buffer, Progress& progress);
   Step readMore(std::span<std::byte> buffer, size_t& bytes);

@@ -2,6 +2,7 @@
 #include <cstring>
 #include <utility>
 
+#include "platform/Clock.h"
 #include "platform/Limits.h"
 #include "platform/LineLimits.h"
 #include "platform/ipc/DBusConnection.h"
@@ -51,6 +52,7 @@ void DBusConnection::turn() {
     Turn deferring;
     HeldOutput held(deferring, *output_);
     Progress progress;
+    progress.begin = context_->services.clock.monotonic();
     step = runSteps(progress);
     if (step == Step::broken || step == Step::ended) end(step == Step::broken, false);
     if (step == Step::stopped) end(false, finishing_ && !hurried_);
@@ -86,11 +88,18 @@ void DBusConnection::messageTookTooLong() {
 DBusConnection::Step DBusConnection::runSteps(Progress& progress) {
   ReadBuffers::Buffer buffer = context_->buffers.take();
   Step result = Step::more;
-  while (result == Step::more && progress.calls < Limits::turnCalls && progress.bytes < Limits::turnBytes) {
+  while (result == Step::more && !progress.over && progress.bytes < Limits::turnBytes) {
     result = step({buffer.get(), ReadBuffers::kBytes}, progress);
   }
   context_->buffers.give(std::move(buffer));
   return result;
+}
+
+void DBusConnection::countCall(Progress& progress) const {
+  ++progress.calls;
+  const bool looks = progress.calls % Limits::turnTimeCalls == 0;
+  progress.over = progress.calls >= Limits::turnCalls ||
+                  (looks && context_->services.clock.monotonic() - progress.begin >= Limits::turnTime);
 }
 
 // Looks at what was kept, when that may hold a message, or else reads once; handles what there is.
@@ -198,10 +207,10 @@ DBusConnection::Step DBusConnection::handleBytes(std::span<const std::byte> byte
     if (taken == 0) break;  // not a whole message
     needed_ = 0;
     ++messages_;
-    ++progress.calls;
+    countCall(progress);
     if (invalidating_) return Step::stopped;
     if (mustPause()) return Step::paused;
-    if (progress.calls >= Limits::turnCalls) break;
+    if (progress.over) break;
   }
   if (descriptors_.size() > Limits::maxDescriptorsPerMessage && needed_ != 0) {
     return breakOff(Reason::malformedMessage, "more descriptors came than a message may carry");

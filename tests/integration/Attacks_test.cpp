@@ -1,6 +1,8 @@
 // Clients of one user that take all they can get of the daemon, and another user's events beside them: none is lost,
 // and each is answered as if the former were not there.
+#include <fcntl.h>
 #include <grp.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
@@ -22,20 +24,25 @@ namespace {
 using test::PlainClient;
 
 constexpr uid_t kNobody = 65534;
+constexpr uid_t kStranger = 65533;  // without a grant
 constexpr int kTorvel = 5;
 
-// A process of another user that does its worst, says so, and stays until it is killed.
+// A process of another user that does its worst, says so, and does it again and again until it is killed.
 class Attacker {
  public:
-  Attacker(const std::string& socket, const std::function<void(const std::string& socket)>& work) {
+  Attacker(const std::string& socket, const std::function<void(const std::string& socket)>& work,
+           uid_t user = kNobody) {
     int ends[2];
     if (::pipe(ends) != 0) return;
     pid_ = ::fork();
     if (pid_ == 0) {
-      if (::setgroups(0, nullptr) != 0 || ::setgid(kNobody) != 0 || ::setuid(kNobody) != 0) ::_exit(126);
-      work(socket);
-      if (::write(ends[1], "x", 1) != 1) ::_exit(1);
-      for (;;) ::pause();
+      if (::setgroups(0, nullptr) != 0 || ::setgid(user) != 0 || ::setuid(user) != 0) ::_exit(126);
+      ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+      ::fcntl(ends[1], F_SETFL, O_NONBLOCK);
+      for (;;) {
+        work(socket);
+        static_cast<void>(::write(ends[1], "x", 1));
+      }
     }
     ::close(ends[1]);
     done_ = ends[0];
@@ -49,6 +56,7 @@ class Attacker {
   }
   Attacker(const Attacker&) = delete;
   Attacker& operator=(const Attacker&) = delete;
+  // Whether all of the attack has been made once.
   [[nodiscard]] bool isDone(std::chrono::milliseconds patience = std::chrono::seconds(0)) const {
     pollfd waiting{done_, POLLIN, 0};
     return ::poll(&waiting, 1, static_cast<int>(patience.count())) == 1;
@@ -59,11 +67,8 @@ class Attacker {
   int done_ = -1;
 };
 
-// Connections that the daemon may end at any time.
-std::vector<std::unique_ptr<PlainClient>>& kept() {
-  static std::vector<std::unique_ptr<PlainClient>> connections;
-  return connections;
-}
+// Connections that the daemon may end at any time, kept until the next round.
+using Connections = std::vector<std::unique_ptr<PlainClient>>;
 
 std::string manyIntrospections(size_t bytes) {
   std::string calls;
@@ -116,16 +121,26 @@ class AttackedDaemon : public HierarchyTest {
     std::filesystem::permissions(stage_->folder(), std::filesystem::perms(0755));
     victim_ = open("victim", -1, 1);
   }
-  // So many events, each taken by the daemon before the next.
-  Latency eventsOfTheVictim(int count, const char* when) {
+  // The events of three phases, each event taken by the daemon before the next. Of the phases the quietest counts: what
+  // else this machine does comes and goes, what the attack costs is there in each.
+  Latency eventsOfTheVictim(const char* when) {
+    Latency quietest = eventsOfOnePhase(when);
+    for (int phase = 1; phase < 3; ++phase) {
+      const Latency latency = eventsOfOnePhase(when);
+      if (latency.p99 < quietest.p99) quietest = latency;
+    }
+    return quietest;
+  }
+  Latency eventsOfOnePhase(const char* when) {
+    constexpr int kEvents = 100;
     std::vector<double> milliseconds;
-    for (int i = 0; i < count; ++i) {
+    for (int i = 0; i < kEvents; ++i) {
       const auto begin = std::chrono::steady_clock::now();
       sendAndSettle(*victim_, kCategory, R"({"k":1})");
       milliseconds.push_back(
           std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - begin).count());
     }
-    sent_ += count;
+    sent_ += kEvents;
     std::sort(milliseconds.begin(), milliseconds.end());
     const auto at = [&](double part) {
       return milliseconds[static_cast<size_t>(part * static_cast<double>(milliseconds.size() - 1))];
@@ -153,9 +168,9 @@ class AttackedDaemon : public HierarchyTest {
     for (const auto& each : std::filesystem::directory_iterator(folder)) count += each.exists() ? 1 : 1;
     return count;
   }
-  // While the attack goes on, whatever the other clients of this machine do meanwhile.
-  void expectBearable(const Latency& before, const Latency& during) {
-    EXPECT_LT(during.p99, 2 * before.p99 + 500);
+  // At most twice what it was, and what the scheduler may take of a daemon that has work beside other tests.
+  static void expectBearable(const Latency& before, const Latency& during) {
+    EXPECT_LT(during.p99, 2 * before.p99 + (kSanitized ? 200 : 40));
   }
 
   Process victim_;
@@ -165,18 +180,19 @@ class AttackedDaemon : public HierarchyTest {
 TEST_F(AttackedDaemon, KeepsItsMemoryFromClientsThatReadNoReplies) {
   start("[limits]\nmax_bytes_per_user = 16777216\n");
   if (IsSkipped()) return;
-  const Latency before = eventsOfTheVictim(100, "alone");
+  const Latency before = eventsOfTheVictim("alone");
   const Attacker attacker(socket(), [](const std::string& path) {
     raiseDescriptorLimit();
     const std::string calls = manyIntrospections(140000);
+    Connections kept;
     for (int i = 0; i < 300; ++i) {
       auto client = std::make_unique<PlainClient>(path);
       if (client->connected() && client->shakeHands()) sendWhatIsTaken(*client, calls);
-      kept().push_back(std::move(client));
+      kept.push_back(std::move(client));
     }
   });
   long most = 0;
-  Latency during = eventsOfTheVictim(100, "attacked");
+  const Latency during = eventsOfTheVictim("attacked");
   for (int round = 0; round < 600 && !attacker.isDone(std::chrono::milliseconds(100)); ++round)
     most = std::max(most, anonymousKiB());
   EXPECT_TRUE(attacker.isDone());
@@ -191,24 +207,30 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromClientsThatReadNoReplies) {
 TEST_F(AttackedDaemon, KeepsItsDescriptorsFromClientsThatDoNotFinishTheirMessages) {
   start("[limits]\nmax_descriptors_per_user = 1000\n");
   if (IsSkipped()) return;
-  const Latency before = eventsOfTheVictim(100, "alone");
+  const Latency before = eventsOfTheVictim("alone");
   const size_t descriptorsBefore = descriptors();
   const Attacker attacker(socket(), [](const std::string& path) {
     raiseDescriptorLimit();
     std::string half = manyIntrospections(1);
     half.resize(half.size() - 10);
+    Connections kept;
     for (int i = 0; i < 200; ++i) {
       auto client = std::make_unique<PlainClient>(path);
       if (client->connected() && client->shakeHands()) client->send(half, std::vector<int>(16, 0));
-      kept().push_back(std::move(client));
+      kept.push_back(std::move(client));
     }
   });
-  const Latency during = eventsOfTheVictim(100, "attacked");
-  EXPECT_TRUE(attacker.isDone(std::chrono::seconds(60)));
-  const size_t held = descriptors();
-  std::printf("the daemon: %zu descriptors, %zu before\n", held, descriptorsBefore);
-  EXPECT_GT(held, descriptorsBefore + 500) << "the attack took place";
-  EXPECT_LT(held, descriptorsBefore + 1000 + 50);
+  const Latency during = eventsOfTheVictim("attacked");
+  size_t most = 0;
+  EXPECT_TRUE(eventually([&] {
+    most = std::max(most, descriptors());
+    return most > descriptorsBefore + 500;
+  })) << "the attack took place";
+  for (int round = 0; round < 100 && !attacker.isDone(std::chrono::milliseconds(100)); ++round)
+    most = std::max(most, descriptors());
+  EXPECT_TRUE(attacker.isDone());
+  std::printf("the daemon: %zu descriptors, %zu before\n", most, descriptorsBefore);
+  EXPECT_LT(most, descriptorsBefore + 1000 + 50);
   EXPECT_TRUE(logged("its user's clients hold too many descriptors")) << daemonLog();
   expectBearable(before, during);
   expectNothingLost();
@@ -218,7 +240,7 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
   start("[limits]\nmax_bytes_per_user = 16777216\n");
   if (IsSkipped()) return;
   std::filesystem::copy(stage_->program("kytctl"), stage_->folder() + "/kytctl");
-  const Latency before = eventsOfTheVictim(100, "alone");
+  const Latency before = eventsOfTheVictim("alone");
   std::vector<Process> hostile;
   for (int i = 0; i < 10; ++i) {
     hostile.push_back(std::make_unique<ScriptedClient>(
@@ -231,7 +253,7 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
     for (const Process& client : hostile)
       client->step("{\"do\":\"send\",\"category\":9,\"type\":1,\"repeat\":50,\"payload\":{\"t\":\"" +
                    std::string(4000, 'x') + "\"}}");
-    if (round == 19) during = eventsOfTheVictim(100, "attacked");
+    if (round == 19) during = eventsOfTheVictim("attacked");
     for (const Process& client : hostile)
       EXPECT_EQ(client->ask(R"({"do":"displayURL"})"), "https://display.example.org/");
   }
@@ -247,7 +269,7 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
 TEST_F(AttackedDaemon, KeepsItsLogFromAClientThatFloodsIt) {
   start("");
   if (IsSkipped()) return;
-  const Latency before = eventsOfTheVictim(100, "alone");
+  const Latency before = eventsOfTheVictim("alone");
   const std::string line = "updateCorrelatedSessions: Session 77 has no correlated sessions";
   const Attacker attacker(socket(), [](const std::string& path) {
     PlainClient client(path);
@@ -267,14 +289,34 @@ TEST_F(AttackedDaemon, KeepsItsLogFromAClientThatFloodsIt) {
     static_cast<void>(client.receiveText());
   });
   const auto begin = std::chrono::steady_clock::now();
-  const Latency during = eventsOfTheVictim(100, "attacked");
+  const Latency during = eventsOfTheVictim("attacked");
   ASSERT_TRUE(attacker.isDone(std::chrono::seconds(120)));
-  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
   EXPECT_TRUE(eventually([&] { return logged("lines of clients of user 65534 left out"); })) << daemonLog();
   const size_t lines = countLogged(line);
-  std::printf("%zu of 20000 lines in %.1f seconds\n", lines, seconds);
+  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+  std::printf("%zu lines in %.1f seconds\n", lines, seconds);
   EXPECT_GE(lines, 200u) << "the attack took place";
   EXPECT_LE(static_cast<double>(lines), 200 * (seconds + 2));
+  expectBearable(before, during);
+  expectNothingLost();
+}
+
+TEST_F(AttackedDaemon, KeepsItsTimeFromProgramsThatMayNotConnect) {
+  start("");
+  if (IsSkipped()) return;
+  const Latency before = eventsOfTheVictim("alone");
+  const Attacker attacker(
+      socket(),
+      [](const std::string& path) {
+        for (int i = 0; i < 500; ++i) {
+          PlainClient client(path);
+          static_cast<void>(client.connected() && client.shakeHands());
+        }
+      },
+      kStranger);
+  const Latency during = eventsOfTheVictim("attacked");
+  EXPECT_TRUE(attacker.isDone(std::chrono::seconds(60)));
+  EXPECT_TRUE(logged("user 65533: no grant")) << daemonLog();
   expectBearable(before, during);
   expectNothingLost();
 }

@@ -212,6 +212,18 @@ TEST_F(DBusConnectionTest, HandsItsWorkerBackAfter256Calls) {
   EXPECT_EQ(reactor_.waitsFor(kStream), ready::readable);
 }
 
+TEST_F(DBusConnectionTest, HandsItsWorkerBackWhenItsCallsTakeLong) {
+  session_->onDisplayURL = [this](StringReply reply) {
+    clock_.advance(std::chrono::microseconds(5));
+    reply("url");
+  };
+  shakeHands();
+  say(displayURLCalls(120));
+  std::vector<int> callsAfterTurn;
+  while (executor_.runOne()) callsAfterTurn.push_back(session_->calls);
+  EXPECT_EQ(callsAfterTurn, (std::vector<int>{48, 96, 120})) << "200 microseconds, looked at after every 16";
+}
+
 TEST_F(DBusConnectionTest, HandsItsWorkerBackAfterAMebibyte) {
   shakeHands();
   std::string bytes;

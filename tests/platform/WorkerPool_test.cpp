@@ -330,6 +330,28 @@ TEST(WorkerPool, RunsQueuesInTheOrderOfTheirSubmission) {
   EXPECT_EQ(order, (std::vector<int>{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}));
 }
 
+TEST(WorkerPool, LetsOwnersTakeTurnsHoweverManyQueuesOneHasMadeReady) {
+  WorkerPool pool(options(1));
+  Holders holders;
+  holders.add(pool, 1);
+  EXPECT_TRUE(eventually([&] { return holders.inside == 1; }));
+  std::string order;
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  Semaphore done;
+  const auto submit = [&](uint64_t owner, char name) {
+    queues.push_back(SerialQueue::create("test", pool, owner));
+    queues.back()->async([&order, &done, name] {
+      order += name;
+      done.signal();
+    });
+  };
+  for (int i = 0; i < 100; ++i) submit(1000, 'a');
+  submit(1001, 'X');
+  holders.go = true;
+  for (int i = 0; i < 101; ++i) ASSERT_TRUE(done.waitFor(kDeadline));
+  EXPECT_EQ(order.substr(0, 2), "aX");
+}
+
 TEST(WorkerPool, LetsAQueueWithEndlessWorkTakeTurnsWithOthers) {
   WorkerPool pool(options(1));
   auto endless = SerialQueue::create("endless", pool);

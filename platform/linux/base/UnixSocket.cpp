@@ -106,6 +106,7 @@ StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descripto
       int received = -1;
       std::memcpy(&received, CMSG_DATA(header) + at, sizeof received);
       descriptors.push_back(ownDescriptorOfPeer(received));
+      room_->noteUsed(received);
     }
   }
   const bool tooMany = descriptors.size() > Limits::maxDescriptorsPerMessage;
@@ -216,7 +217,8 @@ AcceptStatus UnixSocketAcceptor::accept(std::unique_ptr<Stream>& stream) {
   Descriptor socket =
       ownDescriptorOfPeer(::accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
   if (socket.get() >= 0) {
-    stream = std::make_unique<UnixStream>(std::move(socket));
+    room_->noteUsed(socket.get());
+    stream = std::make_unique<UnixStream>(std::move(socket), room_);
     return AcceptStatus::accepted;
   }
   switch (errno) {

@@ -9,6 +9,7 @@
 
 #include "platform/Error.h"
 #include "platform/Stream.h"
+#include "platform/linux/base/DescriptorRoom.h"
 
 namespace kyt {
 
@@ -17,7 +18,8 @@ namespace kyt {
 
 class UnixStream final : public Stream {
  public:
-  explicit UnixStream(Descriptor socket) : socket_(std::move(socket)) {}
+  UnixStream(Descriptor socket, std::shared_ptr<DescriptorRoom> room)
+      : socket_(std::move(socket)), room_(std::move(room)) {}
   [[nodiscard]] StreamResult read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) override;
   [[nodiscard]] StreamResult write(std::string_view bytes) override;
   [[nodiscard]] PeerCredentials peer() override;
@@ -25,8 +27,10 @@ class UnixStream final : public Stream {
 
  private:
   const Descriptor socket_;
+  const std::shared_ptr<DescriptorRoom> room_;  // of all streams of one acceptor
 };
 
+// Made before there are threads: it makes room for the descriptors of its connections.
 class UnixSocketAcceptor final : public StreamAcceptor {
  public:
   // Binds and listens at `path` with mode 0666 (who may connect is the entitlements' matter). The error's
@@ -49,6 +53,7 @@ class UnixSocketAcceptor final : public StreamAcceptor {
   UnixSocketAcceptor(Descriptor socket, std::string path, uint64_t device, uint64_t inode)
       : socket_(std::move(socket)), path_(std::move(path)), device_(device), inode_(inode) {}
   const Descriptor socket_;
+  const std::shared_ptr<DescriptorRoom> room_ = std::make_shared<DescriptorRoom>();
   const std::string path_;  // of the socket that this object made
   const uint64_t device_, inode_;
 };
