@@ -1,11 +1,20 @@
 // One reporting program of the soak: sessions one after another until its time is over, then a line with its books. A
 // "steady" one behaves and must lose nothing; a "wild" one calls everything with everything.
 //
-//   kyt_soak_client steady|wild SOCKET NONCE SEED SECONDS
+//   kyt_soak_client steady|wild SOCKET NONCE SEED SECONDS PACE BOOK
 //
-// Each event carries NONCE and a number of its own, by which the server knows whether it arrived, and how often.
+// Each event carries NONCE and a number of its own, by which the server knows whether it arrived, and how often. BOOK is
+// a file of as many eight-byte entries as there may be events; the one of that number says when the event was handed over
+// (monotonic milliseconds, times four) and what became of that (see Entry). A program that is killed leaves its book too.
+// PACE: a steady program pauses for up to so many milliseconds between its bursts.
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <chrono>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
@@ -23,6 +32,39 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 constexpr auto kPatience = std::chrono::seconds(60);
+
+enum class Entry : int64_t { never, handedOver, accepted, refused };
+
+// The file that tells of each event, shared with whoever looks at it.
+class EventBook {
+ public:
+  explicit EventBook(const char* path) {
+    const int file = ::open(path, O_RDWR | O_CLOEXEC);
+    struct stat status {};
+    if (file < 0 || ::fstat(file, &status) != 0) std::abort();
+    void* mapped =
+        ::mmap(nullptr, static_cast<size_t>(status.st_size), PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
+    ::close(file);
+    if (mapped == MAP_FAILED) std::abort();
+    entries_ = static_cast<int64_t*>(mapped);
+    size_ = static_cast<size_t>(status.st_size) / sizeof(int64_t);
+  }
+  // The number of an event that is handed over now.
+  uint64_t next() {
+    if (++number_ >= size_) std::abort();
+    write(Entry::handedOver);
+    return number_;
+  }
+  // What became of the one that next() gave last.
+  void write(Entry entry) {
+    const auto now = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now().time_since_epoch());
+    __atomic_store_n(entries_ + number_, now.count() * 4 + static_cast<int64_t>(entry), __ATOMIC_RELAXED);
+  }
+
+ private:
+  int64_t* entries_;
+  uint64_t number_ = 0, size_;
+};
 
 class Books {
  public:
@@ -61,8 +103,8 @@ class Books {
 
 class Program {
  public:
-  Program(std::string socket, std::string nonce, uint64_t seed)
-      : socket_(std::move(socket)), nonce_(std::move(nonce)), random_(seed) {}
+  Program(std::string socket, std::string nonce, uint64_t seed, uint64_t pace, const char* book)
+      : socket_(std::move(socket)), nonce_(std::move(nonce)), random_(seed), pace_(pace), book_(book) {}
 
   void runSteady(Clock::time_point end) {
     while (Clock::now() < end) steadySession();
@@ -92,7 +134,7 @@ class Program {
   std::string text(size_t most) { return std::string(draw(most), static_cast<char>('a' + draw(26))); }
 
   Dictionary payload() {
-    Dictionary event{{"nonce", nonce_}, {"n", static_cast<int64_t>(++number_)}};
+    Dictionary event{{"nonce", nonce_}, {"number", static_cast<int64_t>(book_.next())}};
     for (uint64_t left = draw(12); left > 0; --left) {
       const std::string key = "field" + std::to_string(left);
       if (draw(2) == 0)
@@ -135,15 +177,18 @@ class Program {
       books_.addProblem("no answer to a configuration");
     for (uint64_t left = 1 + draw(6); left > 0; --left) {
       for (uint64_t burst = 1 + draw(100); burst > 0; --burst)
-        books_.accepted +=
-            session->sendMessage(static_cast<uint16_t>(1 + draw(5)), 1, payload(), draw(20) == 0 ? 1 : 0) ? 1
-                                                                                                          : 0;
+        report(*session, 1 + draw(5), 1, draw(20) == 0 ? 1 : 0);
       ask(*session);
-      // What the soak's own server can take: a backlog would be cut off where the daemon is told to end.
-      std::this_thread::sleep_for(std::chrono::milliseconds(draw(100)));
+      std::this_thread::sleep_for(std::chrono::milliseconds(draw(pace_ + 1)));
     }
     if (!session->finish(kPatience)) books_.addProblem("not finished in time");
     books_.add(session->statistics());
+  }
+  void report(KYTReporting& session, uint64_t category, uint64_t type, uint64_t flag) {
+    const bool taken = session.sendMessage(static_cast<uint32_t>(category), static_cast<uint32_t>(type),
+                                           payload(), static_cast<uint32_t>(flag));
+    book_.write(taken ? Entry::accepted : Entry::refused);
+    if (taken) ++books_.accepted;
   }
   // A round trip that no server has a part in.
   void ask(KYTReporting& session) {
@@ -197,16 +242,14 @@ class Program {
             1, 1, Dictionary{{"long", std::string(draw(10) == 0 ? 1500000 : 50000, 'x')}, {"\xff", "\xfe"}}));
         return;
       default:
-        for (uint64_t burst = draw(50); burst > 0; --burst)
-          static_cast<void>(session.sendMessage(static_cast<uint16_t>(draw(7)),
-                                                static_cast<uint16_t>(draw(4)), payload(),
-                                                static_cast<uint32_t>(draw(5))));
+        for (uint64_t burst = draw(50); burst > 0; --burst) report(session, draw(7), draw(4), draw(5));
     }
   }
 
   std::string socket_, nonce_;
   std::mt19937_64 random_;
-  uint64_t number_ = 0;
+  uint64_t pace_;
+  EventBook book_;
   Books books_;
 };
 
@@ -214,13 +257,14 @@ class Program {
 }  // namespace kyt
 
 int main(int argc, char** argv) {
-  if (argc != 6) {
-    std::fprintf(stderr, "usage: kyt_soak_client steady|wild SOCKET NONCE SEED SECONDS\n");
+  if (argc != 8) {
+    std::fprintf(stderr, "usage: kyt_soak_client steady|wild SOCKET NONCE SEED SECONDS PACE BOOK\n");
     return 2;
   }
   const std::string kind = argv[1];
   const auto end = kyt::Clock::now() + std::chrono::seconds(std::strtoul(argv[5], nullptr, 10));
-  kyt::Program program(argv[2], argv[3], std::strtoull(argv[4], nullptr, 10));
+  kyt::Program program(argv[2], argv[3], std::strtoull(argv[4], nullptr, 10),
+                       std::strtoull(argv[6], nullptr, 10), argv[7]);
   if (kind == "steady")
     program.runSteady(end);
   else
