@@ -65,21 +65,20 @@ class Books : public HttpHandler {
     rapidjson::Document document;
     document.Parse(text.data(), text.size());
     if (document.HasParseError() || !document.IsObject()) return false;
-    const auto records = document.FindMember("events");
-    if (records == document.MemberEnd() || !records->value.IsArray()) return false;
+    if (!document.HasMember("events") || !document["events"].IsArray()) return false;
     bool good = true;
     MutexLock lock(mutex_);
-    for (const auto& record : records->value.GetArray()) {
+    for (const auto& record : document["events"].GetArray()) {
       if (record.IsObject() && record.HasMember("nonce")) good = enter(record) && good;
     }
     return good;
   }
   bool enter(const rapidjson::Value& record) REQUIRES(mutex_) {
-    const auto nonce = record.FindMember("nonce"), number = record.FindMember("number");
-    if (!nonce->value.IsString() || number == record.MemberEnd() || !number->value.IsUint64()) return false;
-    const uint64_t index = number->value.GetUint64();
+    if (!record["nonce"].IsString() || !record.HasMember("number") || !record["number"].IsUint64())
+      return false;
+    const uint64_t index = record["number"].GetUint64();
     if (index >= kMostEvents) return false;
-    std::vector<char>& book = books_[nonce->value.GetString()];
+    std::vector<char>& book = books_[record["nonce"].GetString()];
     if (book.size() <= index) book.resize(index + 1);
     if (static_cast<uint8_t>(book[index]) < UINT8_MAX) ++book[index];
     ++events_;
