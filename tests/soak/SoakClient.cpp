@@ -4,8 +4,10 @@
 //   kyt_soak_client steady|wild SOCKET NONCE SEED SECONDS PACE BOOK
 //
 // Each event carries NONCE and a number of its own, by which the server knows whether it arrived, and how often. BOOK is
-// a file of as many eight-byte entries as there may be events; the one of that number says when the event was handed over
-// (monotonic milliseconds, times four) and what became of that (see Entry). A program that is killed leaves its book too.
+// a file of as many eight-byte entries as there may be events. The first says how many were handed over, the second is
+// written by whoever started this, 1 while steady programs are to wait; the one of an event's number says when it was
+// handed over (monotonic milliseconds, times four) and what became of that (see Entry). A program that is killed leaves
+// its book too.
 // PACE: a steady program pauses for up to so many milliseconds between its bursts.
 #include <fcntl.h>
 #include <sys/mman.h>
@@ -31,7 +33,7 @@ namespace kyt {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-constexpr auto kPatience = std::chrono::seconds(60);
+constexpr auto kPatience = std::chrono::seconds(60), kLongestHold = std::chrono::seconds(10);
 
 enum class Entry : int64_t { never, handedOver, accepted, refused };
 
@@ -53,8 +55,10 @@ class EventBook {
   uint64_t next() {
     if (++number_ >= size_) std::abort();
     write(Entry::handedOver);
+    __atomic_store_n(entries_, static_cast<int64_t>(number_ - 1), __ATOMIC_RELAXED);
     return number_;
   }
+  [[nodiscard]] bool holds() const { return __atomic_load_n(entries_ + 1, __ATOMIC_RELAXED) == 1; }
   // What became of the one that next() gave last.
   void write(Entry entry) {
     const auto now = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now().time_since_epoch());
@@ -63,7 +67,7 @@ class EventBook {
 
  private:
   int64_t* entries_;
-  uint64_t number_ = 0, size_;
+  uint64_t number_ = 1, size_;
 };
 
 class Books {
@@ -180,6 +184,8 @@ class Program {
         report(*session, 1 + draw(5), 1, draw(20) == 0 ? 1 : 0);
       ask(*session);
       std::this_thread::sleep_for(std::chrono::milliseconds(draw(pace_ + 1)));
+      for (const auto end = Clock::now() + kLongestHold; book_.holds() && Clock::now() < end;)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     if (!session->finish(kPatience)) books_.addProblem("not finished in time");
     books_.add(session->statistics());

@@ -5,15 +5,15 @@ import random
 import socket
 import time
 
-OTHER_USER = 54321
+OTHER_USERS = (54321, 54322)
 
 
-def become_another():
+def become_another(which=0):
     """In a child: another user, where that is possible."""
     if os.geteuid() == 0:
         os.setgroups([])
-        os.setgid(OTHER_USER)
-        os.setuid(OTHER_USER)
+        os.setgid(OTHER_USERS[which])
+        os.setuid(OTHER_USERS[which])
 
 
 def intrude(path, seed, seconds):

@@ -6,7 +6,9 @@ import os
 import resource
 import shutil
 import signal
+import struct
 import subprocess
+import threading
 import time
 
 from intruder import become_another, intrude
@@ -14,6 +16,10 @@ from stage import Failure
 
 STEADY, WILD, INTRUDERS = 3, 4, 3
 MOST_EVENTS = 1 << 22  # of one program in one round
+FIRST_NUMBER = 2
+# Steady programs wait while so many of their events are under way, until fewer are. More than a daemon can post is not
+# asked of it: what waits there counts against its user's share of memory, and beyond that is dropped.
+MOST_UNDER_WAY, FEW_UNDER_WAY = 4000, 1000
 NEVER, HANDED_OVER, ACCEPTED, REFUSED = range(4)  # a book's entries, as the programs write them
 # An event may be lost with the moment that a fault takes. Before the moment: what its session has batched, and no session
 # of a steady program is older. After it: a session that came meanwhile goes on without what was refused to it.
@@ -34,6 +40,15 @@ class Book:
             file.truncate(8 * MOST_EVENTS)
         os.chmod(path, 0o666)
 
+    def handed_over(self):
+        with open(self.path, "rb") as file:
+            return struct.unpack("q", file.read(8))[0]
+
+    def hold(self, holds):
+        with open(self.path, "r+b") as file:
+            file.seek(8)
+            file.write(struct.pack("q", holds))
+
     def close(self):
         entries = array.array("q")
         with open(self.path, "rb") as file:
@@ -53,6 +68,38 @@ class Book:
         return (self.entries[number] >> 2) / 1000
 
 
+class Pacer(threading.Thread):
+    """Lets steady programs wait for the daemon, so that the load is what it can take."""
+
+    def __init__(self, sink, books):
+        super().__init__(daemon=True)
+        self.sink, self.books = sink, books
+        self.over = threading.Event()
+
+    def run(self):
+        # What was lost in a fault will never arrive: it is not under way once nothing else arrives any more.
+        base, arrived, changed, holds = self.sink.figures()["events"], -1, time.monotonic(), False
+        while not self.over.wait(0.03):
+            now, former = time.monotonic(), arrived
+            arrived = self.sink.figures()["events"]
+            under_way = sum(book.handed_over() for book in self.books) - (arrived - base)
+            if arrived != former:
+                changed = now
+            elif holds and now - changed > 1:
+                base -= under_way
+                under_way = 0
+            if under_way > MOST_UNDER_WAY and not holds or under_way < FEW_UNDER_WAY and holds:
+                holds = not holds
+                for book in self.books:
+                    book.hold(holds)
+        for book in self.books:
+            book.hold(False)
+
+    def end(self):
+        self.over.set()
+        self.join()
+
+
 class Round:
     """Its kind: "load", without faults of the daemon itself; "fail", system calls of the daemon fail; "end" and "kill", the
     daemon is ended in order, or killed, and started again. A sharp one has no wild programs, and daemons of its own,
@@ -69,14 +116,14 @@ class Round:
         self.summary = {"accepted": 0, "arrived": 0, "lost": 0, "missing": 0, "p99": 0.0, "worst": 0.0, "before": 0.0,
                         "after": 0.0, "wild": 0}
 
-    def start_client(self, kind, index, other_user):
+    def start_client(self, kind, index, other_user=None):
         nonce = f"{kind}-{self.number}-{index}"
         book = Book(self.stage.path(f"{nonce}.book"))
         output = open(self.stage.path(f"{kind}-{index}.out"), "w+")
         process = subprocess.Popen(
             [self.stage.program("kyt_soak_client"), kind, self.stage.socket, nonce, str(self.draw.getrandbits(32)),
              str(self.seconds), str(self.pace), book.path], stdin=subprocess.DEVNULL, stdout=output,
-            stderr=subprocess.STDOUT, preexec_fn=become_another if other_user else None)
+            stderr=subprocess.STDOUT, preexec_fn=None if other_user is None else lambda: become_another(other_user))
         return nonce, process, output, book
 
     def start_intruder(self):
@@ -99,10 +146,12 @@ class Round:
             self.counted = 0
         used = [stage.processor_seconds(stage.daemon), stage.processor_seconds(stage.sink.process)]
         begin = time.monotonic()
-        self.steady = [self.start_client("steady", index, False) for index in range(STEADY)]
+        self.steady = [self.start_client("steady", index) for index in range(STEADY)]
         if not self.sharp:
-            self.wild = [self.start_client("wild", index, index % 2 == 0) for index in range(WILD)]
+            self.wild = [self.start_client("wild", index, index % 2) for index in range(WILD)]
         self.intruders = [self.start_intruder() for _ in range(INTRUDERS)]
+        pacer = Pacer(stage.sink, [book for _, _, _, book in self.steady])
+        pacer.start()
         ends = {"end": 1, "kill": 2}.get(self.kind, 0)
         ends_at = sorted(begin + self.seconds * draw.uniform(0.2, 0.8) for _ in range(ends))
         while time.monotonic() < begin + self.seconds:
@@ -116,8 +165,9 @@ class Round:
             self.disturb()
         seconds = time.monotonic() - begin
         self.mend()
-        for nonce, process, output, _ in self.steady:
+        for nonce, process, _, _ in self.steady:
             self.wait(nonce, process, 300)
+        pacer.end()
         # Daemons that have ended meanwhile took their figures with them.
         self.load = None if ends else tuple(
             (stage.processor_seconds(process) - before) / seconds
@@ -247,7 +297,7 @@ class Round:
         lost = told["lost"] + told["dropped"]
         arrivals = self.wait_for(nonce, told["accepted"] - lost, 90 if self.kind == "load" else 10)
         missing, doubled, unsent = [], 0, 0
-        for number in range(1, max(len(book.entries), len(arrivals))):
+        for number in range(FIRST_NUMBER, max(len(book.entries), len(arrivals))):
             times = arrivals[number] if number < len(arrivals) else 0
             became = book.became(number)
             if times == 0 and became == ACCEPTED:
@@ -302,6 +352,6 @@ class Round:
         deadline = time.monotonic() + patience
         while True:
             arrivals = self.stage.sink.book(nonce)
-            if len(arrivals) - arrivals[1:].count(0) - 1 >= expected or time.monotonic() > deadline:
+            if len(arrivals) - arrivals.count(0) >= expected or time.monotonic() > deadline:
                 return arrivals
             time.sleep(0.1)

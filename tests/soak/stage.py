@@ -14,7 +14,7 @@ import tempfile
 import threading
 import time
 
-from intruder import OTHER_USER
+from intruder import OTHER_USERS
 from servers import FailingServer, Sink
 
 
@@ -143,7 +143,7 @@ class Stage:
                    f'ca_file = "{self.path("ca/ca.pem")}"\n[log]\ntarget = "stderr"\n')
         self.device()
         grants = ""
-        for user in {os.geteuid(), OTHER_USER}:
+        for user in {os.geteuid(), *OTHER_USERS}:
             grants += f'[[grant]]\nuser = {user}\n"com.vantu.private.kytreportingd" = true\n'
         self.write("etc/kytreportingd/entitlements.d/soak.toml", grants)
         self.put_bags()
