@@ -226,6 +226,24 @@ TEST_P(FailedCalls, AtTheEndDoNotKeepItFromEnding) {
   });
 }
 
+// What watches a socket tries twice by itself.
+TEST_F(FailedCallsFixture, ToWatchASocketCostThatMomentAlsoWhenSeveralFollowEachOther) {
+  for (int first = 1; first <= kCalls; ++first) {
+    SCOPED_TRACE(first);
+    FailingDaemon daemon(server_.url(""));
+    ASSERT_TRUE(startsOrEnds(daemon)) << daemon.log();
+    daemon.fail(kyt_failing_epoll_ctl, ENOSPC, first, 4);
+    tryToReport(daemon);
+    daemon.stopFailing();
+    const auto begin = std::chrono::steady_clock::now();
+    EXPECT_TRUE(reports(daemon)) << daemon.log();
+    EXPECT_LT(std::chrono::steady_clock::now() - begin, 8s)
+        << "as long as a request waits for its connection";
+    endsInOrder(daemon);
+    if (HasFailure()) return;
+  }
+}
+
 // How the daemon ends when the system is not what it was.
 class EndOfTheDaemon : public FailedCallsFixture {
  protected:

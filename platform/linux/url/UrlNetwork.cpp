@@ -212,9 +212,10 @@ void URLNetwork::run() {
       if (stopping_ && commands_.empty()) break;
     }
     epoll_event events[64];
-    const int count = epoll_wait(epoll_, events, 64, deadlines_.millisecondsFrom(now_));
+    const int count = epoll_wait(epoll_, events, 64, waitingTime());
     now_ = currentTime();
     sockets_.beginTurn();
+    if (sockets_.areSomeRefused()) sockets_.watchRefused();
     for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);
   }
   endRetiredPools();
@@ -227,6 +228,13 @@ void URLNetwork::run() {
   MutexLock lock(mutex_);
   threadEnds_ = true;
   changed_.notifyAll();
+}
+
+// In milliseconds, -1: for ever. What the kernel refuses to watch it is soon asked for again.
+int URLNetwork::waitingTime() const {
+  const int time = deadlines_.millisecondsFrom(now_);
+  constexpr int kSoon = 10;
+  return sockets_.areSomeRefused() && (time < 0 || time > kSoon) ? kSoon : time;
 }
 
 void URLNetwork::handleEvent(uint64_t which, uint32_t events) {

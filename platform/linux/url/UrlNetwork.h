@@ -106,6 +106,7 @@ class URLNetwork {
   void wakeUp();
   [[nodiscard]] bool startThread() REQUIRES(mutex_);
   void run();
+  [[nodiscard]] int waitingTime() const;
   void handleEvent(uint64_t which, uint32_t events);
   void takeCommands();
   void begin(std::shared_ptr<URLTransfer> transfer);

@@ -4,6 +4,7 @@
 #include <sys/epoll.h>
 
 #include <cerrno>
+#include <utility>
 
 namespace kyt {
 
@@ -14,11 +15,11 @@ WatchedSockets::Watched& WatchedSockets::at(int socket) {
 }
 
 void WatchedSockets::opened(int socket) {
-  at(socket) = {nullptr, 0, turn_, true};
+  at(socket) = {nullptr, 0, turn_, 0, true};
 }
 
 void WatchedSockets::closed(int socket) {
-  at(socket) = {nullptr, 0, turn_, false};
+  at(socket) = {nullptr, 0, turn_, 0, false};
 }
 
 URLConnectionPool* WatchedSockets::poolOf(int socket) {
@@ -35,6 +36,7 @@ URLConnectionPool* WatchedSockets::poolOf(int socket) {
 
 void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
   Watched& watched = at(socket);
+  watched.refused = 0;
   if (what == CURL_POLL_REMOVE) {
     watched.pool = nullptr;
     watched.left = turn_;
@@ -49,7 +51,21 @@ void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
   const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
                           ((what & CURL_POLL_OUT) != 0 ? uint32_t{EPOLLOUT} : 0);
   watched.pool = &pool;
-  if (watched.events == wanted) return;
+  if (watched.events == wanted || tell(watched, socket, wanted)) return;
+  watched.refused = wanted;
+  refused_.push_back(socket);
+}
+
+void WatchedSockets::watchRefused() {
+  for (const int socket : std::exchange(refused_, {})) {
+    Watched& watched = at(socket);
+    if (watched.refused == 0 || tell(watched, socket, watched.refused)) continue;
+    refused_.push_back(socket);
+  }
+}
+
+// Whether the kernel watches the socket for that from now on.
+bool WatchedSockets::tell(Watched& watched, int socket, uint32_t wanted) {
   epoll_event event{};
   event.events = wanted;
   event.data.u64 = static_cast<uint64_t>(socket);
@@ -57,9 +73,11 @@ void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
   if (epoll_ctl(epoll_, operation, socket, &event) != 0) {
     // What was left open, or a number that the resolver used again without telling: the kernel knows better.
     const int other = errno == EEXIST ? EPOLL_CTL_MOD : EPOLL_CTL_ADD;
-    if (epoll_ctl(epoll_, other, socket, &event) != 0) return;
+    if (epoll_ctl(epoll_, other, socket, &event) != 0) return false;
   }
   watched.events = wanted;
+  watched.refused = 0;
+  return true;
 }
 
 }  // namespace kyt

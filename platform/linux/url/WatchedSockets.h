@@ -24,18 +24,25 @@ class WatchedSockets {
   // The pool that waits for an event of that socket, or null; then the socket is no longer watched, now or at its
   // next event.
   [[nodiscard]] URLConnectionPool* poolOf(int socket);
+  // Whether the kernel has refused to watch a socket; watchRefused() asks it again. libcurl would not hear of that
+  // socket otherwise.
+  [[nodiscard]] bool areSomeRefused() const { return !refused_.empty(); }
+  void watchRefused();
 
  private:
   struct Watched {
     URLConnectionPool* pool = nullptr;  // null: nobody waits for it at the moment
     uint32_t events = 0;                // that the kernel watches; 0: none, or it is not known
     uint32_t left = 0;                  // the turn in which it was closed, or nobody waited for it any more
+    uint32_t refused = 0;               // what the kernel was asked to watch it for, and did not
     bool ours = false;
   };
   Watched& at(int socket);
+  bool tell(Watched& watched, int socket, uint32_t wanted);
   int epoll_ = -1;
   uint32_t turn_ = 1;
   std::vector<Watched> sockets_;
+  std::vector<int> refused_;
 };
 
 }  // namespace kyt

@@ -93,8 +93,6 @@ WRAPPED(int, -1, bind, (int fd, const struct sockaddr* address, socklen_t length
 WRAPPED(int, -1, listen, (int fd, int backlog), (fd, backlog))
 WRAPPED(int, -1, connect, (int fd, const struct sockaddr* address, socklen_t length), (fd, address, length))
 WRAPPED(int, -1, epoll_create1, (int flags), (flags))
-WRAPPED(int, -1, epoll_ctl, (int epoll, int what, int fd, struct epoll_event* event),
-        (epoll, what, fd, event))
 WRAPPED(int, -1, epoll_wait, (int epoll, struct epoll_event* events, int most, int timeout),
         (epoll, events, most, timeout))
 WRAPPED(int, -1, eventfd, (unsigned value, int flags), (value, flags))
@@ -133,6 +131,12 @@ WRAPPED(void*, MAP_FAILED, mmap, (void* where, size_t size, int protection, int 
         (where, size, protection, flags, fd, offset))
 WRAPPED(int, -1, statfs, (const char* path, struct statfs* status), (path, status))
 WRAPPED(pid_t, -1, waitpid, (pid_t process, int* status, int options), (process, status, options))
+
+/* The kernel never refuses to forget what it watches: for that it needs neither memory nor room. */
+int epoll_ctl(int epoll, int what, int fd, struct epoll_event* event) {
+  REAL(epoll_ctl);
+  return what != EPOLL_CTL_DEL && fails(kyt_failing_epoll_ctl) ? -1 : real(epoll, what, fd, event);
+}
 
 /* Those that take a third argument only sometimes. */
 static mode_t modeOf(int flags, va_list more) {
