@@ -28,63 +28,58 @@ bool DefaultBackendFactory::isExcludedOnThisDevice(const String& name) const {
 }
 
 std::shared_ptr<KYTReportingBackend> DefaultBackendFactory::newBackendWithName(
-    const String& name, const Dictionary& profile, std::optional<String> productFamily, int32_t clientType) {
+    const String& name, const Dictionary& profile, const SharedSessionFacts& facts) {
   for (const BackendCreator& creator : creators_) {
     if (creator.name != name) continue;
     if (isExcludedOnThisDevice(name)) break;
-    return creator.create(name, profile, productFamily, clientType);
+    return creator.create(name, profile, facts);
   }
   configuration_.platform.log.error("KYTReportingBackend(newBackendWithName): %s", name.c_str());
   return nullptr;
 }
 
+SharedSessionFacts DefaultBackendFactory::factsOf(const Dictionary& sessionInfo, const String& udid) const {
+  Platform& platform = configuration_.platform;
+  DeviceIdentity& device = configuration_.deviceIdentity;
+  auto facts = std::make_shared<SessionFacts>();
+  facts->setStartTimestamp(platform.clock.timeOfDay());
+  facts->productVersion = device.productVersion();
+  facts->buildVersion = device.buildVersion();
+  facts->hardwareType = device.productType();
+  facts->productFamily = device.deviceName();
+  facts->isInternal = device.isInternalBuild();
+  facts->udid = udid;
+  facts->setSelfVersion(platform.daemonBundle.version().value_or(String("8.0")));
+  facts->sessionID = entryOf(sessionInfo, kKYTReportingSessionInfoSessionID).unsignedIntValue();
+  facts->compType = entryOf(sessionInfo, kKYTReportingSessionInfoClientType).intValue();
+  facts->clientVersion =
+      static_cast<uint16_t>(entryOf(sessionInfo, kKYTReportingSessionInfoClientVersion).intValue());
+  facts->requireUserInfo = entryOf(sessionInfo, kKYTReportingSessionInfoRequireUserInfo).boolValue();
+  facts->batchEvents = entryOf(sessionInfo, kKYTReportingSessionInfoBatchEvent).boolValue();
+  return facts;
+}
+
 std::optional<Backends> DefaultBackendFactory::createBackends(const std::optional<Dictionary>& table,
                                                               const std::optional<Dictionary>& sessionInfo,
                                                               const std::optional<Dictionary>& userInfo,
-                                                              const char* udid) {
-  Platform& platform = configuration_.platform;
-  DeviceIdentity& device = configuration_.deviceIdentity;
+                                                              const String& udid) {
+  Log& log = configuration_.platform.log;
   if (!table) {
-    platform.log.error("createBackends: Attempted to create backends with nil storebag");
+    log.error("createBackends: Attempted to create backends with nil storebag");
     return std::nullopt;
   }
   if (!sessionInfo) {
-    platform.log.error("createBackends: Attempted to create backends with nil session info");
+    log.error("createBackends: Attempted to create backends with nil session info");
     return std::nullopt;
   }
-  const TimeValue startTime = platform.clock.timeOfDay();
-  const std::optional<String> productVersion = device.productVersion();
-  const std::optional<String> buildVersion = device.buildVersion();
-  const std::optional<String> productType = device.productType();
-  const std::optional<String> deviceName = device.deviceName();
-  const bool isInternal = device.isInternalBuild();
-  const String selfVersion = platform.daemonBundle.version().value_or(String("8.0"));
-  const uint32_t sessionID = entryOf(*sessionInfo, kKYTReportingSessionInfoSessionID).unsignedIntValue();
-  const int32_t clientType = entryOf(*sessionInfo, kKYTReportingSessionInfoClientType).intValue();
-  const auto clientVersion =
-      static_cast<uint16_t>(entryOf(*sessionInfo, kKYTReportingSessionInfoClientVersion).intValue());
-  const bool requireUserInfo = entryOf(*sessionInfo, kKYTReportingSessionInfoRequireUserInfo).boolValue();
-  const bool batchEvents = entryOf(*sessionInfo, kKYTReportingSessionInfoBatchEvent).boolValue();
-
+  const SharedSessionFacts facts = factsOf(*sessionInfo, udid);
   Backends backends;
   for (const DictionaryEntry& entry : *table) {
     const Dictionary* profile = entry.value.dictionary();
     std::shared_ptr<KYTReportingBackend> backend =
-        newBackendWithName(entry.key, profile != nullptr ? *profile : Dictionary(), deviceName, clientType);
+        newBackendWithName(entry.key, profile != nullptr ? *profile : Dictionary(), facts);
     if (backend == nullptr) continue;
-    backend->setSessionID(sessionID);
-    backend->setCompType(clientType);
-    backend->setClientVersion(clientVersion);
-    backend->setUdid(udid);
-    backend->setProductVersion(productVersion);
-    backend->setBuildVersion(buildVersion);
-    backend->setHardwareType(productType);
-    backend->setIsInternal(isInternal);
-    backend->setRequireUserInfo(requireUserInfo);
-    backend->setBatchEvents(batchEvents);
-    backend->setUserInfoDict(userInfo);
-    backend->setSelfVersion(selfVersion);
-    backend->setStartTimestamp(startTime);
+    backend->setUserInfoDict(userInfo);  // a session may change it, so it is none of the facts
     backends.add(entry.key, std::move(backend));
   }
   return backends;

@@ -40,21 +40,18 @@ class BackendFactory {
   virtual ~BackendFactory() = default;
   // The class that the name stands for, or null (unknown name, an initialiser that failed).
   [[nodiscard]] virtual std::shared_ptr<KYTReportingBackend> newBackendWithName(
-      const String& name, const Dictionary& profile, std::optional<String> productFamily,
-      int32_t clientType) = 0;
-  // None when the table or the session information is missing; may be empty. `udid` is borrowed for the back
-  // ends' life.
+      const String& name, const Dictionary& profile, const SharedSessionFacts& facts) = 0;
+  // None when the table or the session information is missing; may be empty. `udid` is the device's identifier.
   [[nodiscard]] virtual std::optional<Backends> createBackends(const std::optional<Dictionary>& table,
                                                                const std::optional<Dictionary>& sessionInfo,
                                                                const std::optional<Dictionary>& userInfo,
-                                                               const char* udid) = 0;
+                                                               const String& udid) = 0;
 };
 
 // One row: a back end's name and how its class is made. Null when the initialiser fails.
 struct BackendCreator {
   using Create = std::function<std::shared_ptr<KYTReportingBackend>(
-      const String& name, const Dictionary& profile, const std::optional<String>& productFamily,
-      int32_t clientType)>;
+      const String& name, const Dictionary& profile, const SharedSessionFacts& facts)>;
   String name;
   Create create;
 };
@@ -65,17 +62,16 @@ class DefaultBackendFactory final : public BackendFactory {
   // Names are compared in the order of `creators`; the first equal one decides.
   DefaultBackendFactory(Configuration& configuration, std::vector<BackendCreator> creators);
 
-  [[nodiscard]] std::shared_ptr<KYTReportingBackend> newBackendWithName(const String& name,
-                                                                        const Dictionary& profile,
-                                                                        std::optional<String> productFamily,
-                                                                        int32_t clientType) override;
+  [[nodiscard]] std::shared_ptr<KYTReportingBackend> newBackendWithName(
+      const String& name, const Dictionary& profile, const SharedSessionFacts& facts) override;
   [[nodiscard]] std::optional<Backends> createBackends(const std::optional<Dictionary>& table,
                                                        const std::optional<Dictionary>& sessionInfo,
                                                        const std::optional<Dictionary>& userInfo,
-                                                       const char* udid) override;
+                                                       const String& udid) override;
 
  private:
   [[nodiscard]] bool isExcludedOnThisDevice(const String& name) const;
+  [[nodiscard]] SharedSessionFacts factsOf(const Dictionary& sessionInfo, const String& udid) const;
   Configuration configuration_;
   const std::vector<BackendCreator> creators_;
 };

@@ -25,22 +25,20 @@ bool holdsCategory(const Array& list, uint16_t category) {
 
 std::shared_ptr<KYTReportingBackend> KYTReportingBackend::initWithName(Platform& platform, String name,
                                                                        Dictionary profile,
-                                                                       std::optional<String> productFamily) {
-  struct Plain final : KYTReportingBackend {
-    Plain(Platform& p, String n, Dictionary d, std::optional<String> f)
-        : KYTReportingBackend(p, std::move(n), std::move(d), std::move(f)) {}
-  };
-  return std::make_shared<Plain>(platform, std::move(name), std::move(profile), std::move(productFamily));
+                                                                       SharedSessionFacts facts) {
+  return std::make_shared<KYTReportingBackend>(Making(), platform, std::move(name), std::move(profile),
+                                               std::move(facts));
 }
 
-KYTReportingBackend::KYTReportingBackend(Platform& platform, String name, Dictionary profile,
-                                         std::optional<String> productFamily)
+KYTReportingBackend::KYTReportingBackend(Making, Platform& platform, String name, Dictionary profile,
+                                         SharedSessionFacts facts)
     : platform_(platform),
       name_(std::move(name)),
       profile_(std::move(profile)),
-      productFamily_(std::move(productFamily)),
+      facts_(std::move(facts)),
       samplingFactor_(platform.random.uniform(101) / 100.0),
-      stateQueue_(SerialQueue::create("com.vantu.KYTReportingBackendStateQueue", platform.executor)) {}
+      stateQueue_(SerialQueue::create("com.vantu.KYTReportingBackendStateQueue", platform.executor)),
+      batchEvents_(facts_->batchEvents) {}
 
 KYTReportingBackend::~KYTReportingBackend() {
   drainStateQueue();
@@ -64,13 +62,6 @@ void KYTReportingBackend::cleanup() {}
 void KYTReportingBackend::setReportingSessionConnectivityDelegate(
     std::weak_ptr<ReportingSessionConnectivityInterface> delegate) {
   reportingSessionConnectivityDelegate_ = std::move(delegate);
-}
-
-void KYTReportingBackend::setSelfVersion(const String& version) {
-  const std::array<uint8_t, 3> parts = versionParts(version);
-  selfVersionMajor_ = parts[0];
-  selfVersionMiddle_ = parts[1];
-  selfVersionMinor_ = parts[2];
 }
 
 int32_t KYTReportingBackend::state() const {
@@ -100,10 +91,6 @@ Value KYTReportingBackend::sendMessage(Dictionary message, const TimeValue& time
                                        uint16_t respCode, MessageFlag flag) {
   ++eventID_;
   return sendMessage(std::move(message), timestamp, method, respCode, EventID{eventID_}, flag);
-}
-
-void KYTReportingBackend::setStartTimestamp(const TimeValue& timestamp) {
-  startTimeStamp_ = timestamp.asSeconds();
 }
 
 Value KYTReportingBackend::flushMessagesWithCompletion(FlushCompletion completion) {

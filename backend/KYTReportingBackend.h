@@ -5,9 +5,11 @@
 //
 // Threads: called on the owning session's queue; `state`, the sampling threshold and the combined session ID,
 // which other sessions of a hierarchy change, and what a subclass says so are kept by the private state
-// queue. The other fields are set once, before the back end is used. Code that runs on the state queue uses
-// the raw fields. Work that is handed to the state queue holds no reference, so a subclass whose work touches
-// its own fields calls drainStateQueue() in its destructor.
+// queue. What a back end is told when it is made (SessionFacts) is constant. Code that runs on the state queue uses
+// the functions whose names end in OnQueue. Work that is handed to the state queue holds no reference, so a subclass
+// whose work touches its own fields calls drainStateQueue() in its destructor.
+//
+// Its operations and properties are a contract with the sessions, so it has more than other classes.
 #pragma once
 
 #include <cstdint>
@@ -18,6 +20,7 @@
 #include <utility>
 
 #include "backend/ReportingSessionConnectivityInterface.h"
+#include "backend/SessionFacts.h"
 #include "backend/SessionIDPath.h"
 #include "platform/Clock.h"
 #include "platform/Error.h"
@@ -53,11 +56,19 @@ inline constexpr int32_t kBackendStateHeld = 3;  // held by sampling
 using FlushCompletion = Function<void(Value result, std::optional<Error> error)>;
 
 class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBackend> {
+ protected:
+  // What a constructor asks for, so that only classes of back ends can make one, through an initWithName(...) that
+  // returns null on failure, and std::make_shared can call it.
+  struct Making {
+    explicit Making() = default;
+  };
+
  public:
   // A back end that does nothing, as the base alone is one.
   static std::shared_ptr<KYTReportingBackend> initWithName(Platform& platform, String name,
-                                                           Dictionary profile,
-                                                           std::optional<String> productFamily);
+                                                           Dictionary profile, SharedSessionFacts facts);
+  // Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
+  KYTReportingBackend(Making, Platform& platform, String name, Dictionary profile, SharedSessionFacts facts);
   KYTReportingBackend(const KYTReportingBackend&) = delete;
   KYTReportingBackend& operator=(const KYTReportingBackend&) = delete;
   virtual ~KYTReportingBackend();
@@ -71,8 +82,6 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // Of the user whose events these are: what is kept for them counts there. Before the first event.
   void setUserAccount(std::shared_ptr<UserAccount> account) { userAccount_ = std::move(account); }
   void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> delegate);
-  // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
-  void setSelfVersion(const String& version);
 
   // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
   // before it.
@@ -91,7 +100,6 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     MessageFlag flag);
 
-  void setStartTimestamp(const TimeValue& timestamp);
   virtual Value flushMessagesWithCompletion(FlushCompletion completion);
   // `extension` names the descriptors that came with the token; the back end that accepts takes them from
   // there.
@@ -107,37 +115,18 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // Plain properties.
   [[nodiscard]] const String& name() const { return name_; }
   [[nodiscard]] const Dictionary& profile() const { return profile_; }
-  [[nodiscard]] uint32_t sessionID() const { return sessionID_; }
-  void setSessionID(uint32_t value) { sessionID_ = value; }
+  [[nodiscard]] const SessionFacts& facts() const { return *facts_; }
+  // Whether events are batched now: what the session asked for, unless the storebag says otherwise.
+  [[nodiscard]] bool batchEvents() const { return batchEvents_; }
+  void setBatchEvents(bool value) { batchEvents_ = value; }
   // Read and written synchronously on the state queue: the agent sets it from another session's thread.
   [[nodiscard]] std::optional<String> combinedSessionIDString() const;
   void setCombinedSessionIDString(std::optional<String> value);
-  [[nodiscard]] int32_t compType() const { return compType_; }
-  void setCompType(int32_t value) { compType_ = value; }
-  [[nodiscard]] uint16_t clientVersion() const { return clientVersion_; }
-  void setClientVersion(uint16_t value) { clientVersion_ = value; }
-  [[nodiscard]] const char* udid() const { return udid_; }
-  void setUdid(const char* value) { udid_ = value; }  // borrowed: storage of the session
   [[nodiscard]] const std::optional<String>& displayURL() const { return displayURL_; }
   void setDisplayURL(std::optional<String> value) { displayURL_ = std::move(value); }
-  [[nodiscard]] const std::optional<String>& productVersion() const { return productVersion_; }
-  void setProductVersion(std::optional<String> value) { productVersion_ = std::move(value); }
-  [[nodiscard]] const std::optional<String>& buildVersion() const { return buildVersion_; }
-  void setBuildVersion(std::optional<String> value) { buildVersion_ = std::move(value); }
-  [[nodiscard]] const std::optional<String>& hardwareType() const { return hardwareType_; }
-  void setHardwareType(std::optional<String> value) { hardwareType_ = std::move(value); }
-  [[nodiscard]] const std::optional<String>& productFamily() const { return productFamily_; }
-  void setProductFamily(std::optional<String> value) { productFamily_ = std::move(value); }
   [[nodiscard]] const std::optional<Dictionary>& userInfoDict() const { return userInfoDict_; }
   virtual void setUserInfoDict(std::optional<Dictionary> value) { userInfoDict_ = std::move(value); }
-  [[nodiscard]] bool isInternal() const { return isInternal_; }
-  void setIsInternal(bool value) { isInternal_ = value; }
-  [[nodiscard]] bool requireUserInfo() const { return requireUserInfo_; }
-  void setRequireUserInfo(bool value) { requireUserInfo_ = value; }
-  [[nodiscard]] bool batchEvents() const { return batchEvents_; }
-  void setBatchEvents(bool value) { batchEvents_ = value; }
   [[nodiscard]] double samplingFactor() const { return samplingFactor_; }
-  void setSamplingFactor(double value) { samplingFactor_ = value; }
   // A number, or null. On the state queue like the combined session ID: children copy their parent's.
   [[nodiscard]] Value samplingThreshold() const;
   void setSamplingThreshold(Value value);
@@ -145,20 +134,24 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   void setDigestKey(std::optional<Data> value) { digestKey_ = std::move(value); }
   [[nodiscard]] int32_t digestAlgorithm() const { return digestAlgorithm_; }
   void setDigestAlgorithm(int32_t value) { digestAlgorithm_ = value; }
-  [[nodiscard]] double startTimeStamp() const { return startTimeStamp_; }
-  [[nodiscard]] uint8_t selfVersionMajor() const { return selfVersionMajor_; }
-  [[nodiscard]] uint8_t selfVersionMiddle() const { return selfVersionMiddle_; }
-  [[nodiscard]] uint8_t selfVersionMinor() const { return selfVersionMinor_; }
 
  protected:
-  // Subclasses are made through a static initWithName(...) that answers null on failure; it calls this
-  // constructor. Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
-  KYTReportingBackend(Platform& platform, String name, Dictionary profile,
-                      std::optional<String> productFamily);
+  [[nodiscard]] Platform& platform() const { return platform_; }
+  [[nodiscard]] const SharedSessionFacts& sharedFacts() const { return facts_; }
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> connectivityDelegate() const {
     return reportingSessionConnectivityDelegate_.lock();
   }
+  [[nodiscard]] const std::shared_ptr<UserAccount>& userAccount() const { return userAccount_; }
+  // Of the latest event.
+  [[nodiscard]] uint16_t eventNumber() const { return eventID_; }
+  void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }
+  void setEventBlacklist(std::optional<Array> list) { eventBlacklist_ = std::move(list); }
   [[nodiscard]] SerialQueue& stateQueue() const { return *stateQueue_; }
+  [[nodiscard]] int32_t stateOnQueue() const { return state_; }
+  [[nodiscard]] const std::optional<SessionIDPath>& combinedSessionIDOnQueue() const {
+    return combinedSessionID_;
+  }
+  void setCombinedSessionIDOnQueue(const SessionIDPath& sessionID) { combinedSessionID_ = sessionID; }
   // Runs what was handed to the state queue and has not begun.
   void drainStateQueue();
   // A random identifier that stays the same on this device, created on first use: one for reports that
@@ -168,33 +161,29 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // is then stored.
   [[nodiscard]] String persistentIdentifier(std::string_view key, const String* made = nullptr);
 
+ private:
   Platform& platform_;
-  String name_;
-  Dictionary profile_;
-  int32_t state_ = 0;  // touched on the state queue only
-  std::optional<String> productVersion_, buildVersion_, hardwareType_, productFamily_;
-  double startTimeStamp_ = 0;  // seconds since 1970
-  uint32_t sessionID_ = 0;
-  std::optional<SessionIDPath> combinedSessionID_;  // touched on the state queue only
-  int32_t compType_ = 0;
-  uint16_t clientVersion_ = 0;
+  const String name_;
+  const Dictionary profile_;
+  const SharedSessionFacts facts_;
+  const double samplingFactor_;
+  const std::shared_ptr<SerialQueue> stateQueue_;
+
+  // The session's queue.
   uint16_t eventID_ = 0;
-  uint8_t selfVersionMajor_ = 0, selfVersionMiddle_ = 0, selfVersionMinor_ = 0;
-  bool isInternal_ = false;
-  bool requireUserInfo_ = false;
-  bool shouldUseWiFiOnly_ = false;
-  std::optional<Dictionary> userInfoDict_;
-  bool batchEvents_ = false;
-  const char* udid_ = "";
+  bool batchEvents_;
   std::optional<String> displayURL_;
-  double samplingFactor_ = 0;
-  Value samplingThreshold_;  // touched on the state queue only
-  std::shared_ptr<SerialQueue> stateQueue_;
+  std::optional<Dictionary> userInfoDict_;
   std::optional<Array> eventWhitelist_, eventBlacklist_;
   std::optional<Data> digestKey_;
   int32_t digestAlgorithm_ = 0;
   std::shared_ptr<UserAccount> userAccount_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
+
+  // The state queue.
+  int32_t state_ = kBackendStateUndecided;
+  std::optional<SessionIDPath> combinedSessionID_;
+  Value samplingThreshold_;
 };
 
 }  // namespace kyt

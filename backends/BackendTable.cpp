@@ -11,29 +11,24 @@ namespace kyt {
 
 std::vector<BackendCreator> backendTable(Configuration& configuration) {
   const BackendCreator::Create newHTTPSPostBackend =
-      [&configuration](const String& name, const Dictionary& profile,
-                       const std::optional<String>& productFamily, int32_t) {
-        return HTTPSPostBackend::initWithName(configuration, name, profile, productFamily);
+      [&configuration](const String& name, const Dictionary& profile, const SharedSessionFacts& facts) {
+        return HTTPSPostBackend::initWithName(configuration, name, profile, facts);
       };
   const BackendCreator::Create newDashboardBackend =
-      [&configuration](const String& name, const Dictionary& profile,
-                       const std::optional<String>& productFamily, int32_t) {
-        return DashboardBackend::initWithName(configuration.platform, name, profile, productFamily);
+      [&configuration](const String& name, const Dictionary& profile, const SharedSessionFacts& facts) {
+        return DashboardBackend::initWithName(configuration.platform, name, profile, facts);
       };
-  const BackendCreator::Create newUploadBackend = [&configuration](
-                                                      const String& name, const Dictionary& profile,
-                                                      const std::optional<String>& productFamily, int32_t) {
-    return UploadBackend::initWithName(configuration, name, profile, productFamily);
-  };
-  const BackendCreator::Create newAmpyxBackend = [&configuration](
-                                                     const String& name, const Dictionary& profile,
-                                                     const std::optional<String>& productFamily, int32_t) {
-    return AmpyxBackend::initWithName(configuration, name, profile, productFamily);
-  };
+  const BackendCreator::Create newUploadBackend =
+      [&configuration](const String& name, const Dictionary& profile, const SharedSessionFacts& facts) {
+        return UploadBackend::initWithName(configuration, name, profile, facts);
+      };
+  const BackendCreator::Create newAmpyxBackend =
+      [&configuration](const String& name, const Dictionary& profile, const SharedSessionFacts& facts) {
+        return AmpyxBackend::initWithName(configuration, name, profile, facts);
+      };
   const BackendCreator::Create newQDXBackend = [&configuration](const String& name, const Dictionary& profile,
-                                                                const std::optional<String>& productFamily,
-                                                                int32_t clientType) {
-    return QDXBackend::initWithName(configuration, name, profile, productFamily, clientType);
+                                                                const SharedSessionFacts& facts) {
+    return QDXBackend::initWithName(configuration, name, profile, facts);
   };
   return {
       {kKYTReportingBackendDashboard, newDashboardBackend},

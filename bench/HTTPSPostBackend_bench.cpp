@@ -36,14 +36,17 @@ struct Stage {
     const Dictionary entry{{"override_dnu", 1},          {"locale_whitelist", Array{"US"}},
                            {"filters", filters},         {"sampling_threshold", 1.0},
                            {"event_threshold", 1 << 30}, {"post_url", "https://post.example.org/"}};
+    SessionFacts facts;
+    facts.compType = 6;
+    facts.requireUserInfo = true;
+    facts.batchEvents = true;
+    facts.productVersion = String("17.4.1");
+    facts.buildVersion = String("21E236");
+    facts.hardwareType = String("Model14,2");
+    facts.productFamily = String("Phone");
     backend = HTTPSPostBackend::initWithName(platform.configuration, String(kKYTReportingBackendHTTPPost),
-                                             Dictionary{{"clients", Array{entry}}}, String("Phone"));
-    backend->setCompType(6);
-    backend->setProductVersion(String("17.4.1"));
-    backend->setBuildVersion(String("21E236"));
-    backend->setHardwareType(String("Model14,2"));
-    backend->setRequireUserInfo(true);
-    backend->setBatchEvents(true);
+                                             Dictionary{{"clients", Array{entry}}},
+                                             std::make_shared<SessionFacts>(facts));
     backend->setUserInfoDict(Dictionary{{kKYTReportingUserInfoClientName, "a"}});
     backend->setReportingSessionConnectivityDelegate(poster);
     backend->updateState();

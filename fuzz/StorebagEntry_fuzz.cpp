@@ -171,17 +171,20 @@ void run(unsigned setup, const Dictionary& section) {
   platform.random.setDraw((setup & 8) != 0 ? 50 : 0);
   platform.deviceProperties.setCountryCode("US");
   if (internal) platform.deviceProperties.setProperty("ReleaseType", "Internal");
+  SessionFacts facts;
+  facts.isInternal = internal;
+  facts.requireUserInfo = requireUserInfo;
+  facts.batchEvents = (setup & 16) != 0;
+  facts.udid = String();
+  facts.hardwareType = String("Phone9,1");
+  facts.productFamily = String("Phone");
+  facts.setSelfVersion("8.0");
   auto backend = HTTPSPostBackend::initWithName(platform.configuration, String(kKYTReportingBackendHTTPPost),
-                                                section, String("Phone"));
+                                                section, std::make_shared<SessionFacts>(facts));
   if (backend == nullptr) return;
   const auto poster = std::make_shared<Poster>();
   backend->setReportingSessionConnectivityDelegate(poster);
-  backend->setIsInternal(internal);
-  backend->setRequireUserInfo(requireUserInfo);
-  backend->setBatchEvents((setup & 16) != 0);
-  backend->setHardwareType(String("Phone9,1"));
   backend->setUserInfoDict(Dictionary{{kKYTReportingUserInfoClientName, "a"}, {"email", "x"}});
-  backend->setSelfVersion("8.0");
 
   int flushes = 0, answers = 0;
   for (uint16_t i = 0; i < 4; ++i) {

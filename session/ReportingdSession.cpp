@@ -158,7 +158,7 @@ void ReportingdSession::startConfigWithCompletionHandler(StatesReply reply) {
 void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
   log().debug("createBackendsWithStorebag: Creating backends for session %u", _sessionID);
   Backends backends = class_.backendFactory()
-                          .createBackends(storebag, _sessionInfo, _userInfo, _deviceid.data())
+                          .createBackends(storebag, _sessionInfo, _userInfo, String(_deviceid.data()))
                           .value_or(Backends());
   for (const auto& [key, backend] : backends) {
     backend->setUserAccount(userAccount_);

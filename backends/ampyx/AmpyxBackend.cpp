@@ -16,27 +16,22 @@ constexpr char kEventName[] = "Medsrv-KYT";
 }  // namespace
 
 std::shared_ptr<AmpyxBackend> AmpyxBackend::initWithName(Configuration& configuration, String name,
-                                                         Dictionary profile,
-                                                         std::optional<String> productFamily) {
-  struct Made final : AmpyxBackend {
-    Made(Platform& p, String n, Dictionary d, std::optional<String> f)
-        : AmpyxBackend(p, std::move(n), std::move(d), std::move(f)) {}
-  };
-  return std::make_shared<Made>(configuration.platform, std::move(name), std::move(profile),
-                                std::move(productFamily));
+                                                         Dictionary profile, SharedSessionFacts facts) {
+  return std::make_shared<AmpyxBackend>(Making(), configuration.platform, std::move(name), std::move(profile),
+                                        std::move(facts));
 }
 
 Value AmpyxBackend::sendMessage(const Dictionary& message, const TimeValue&, uint16_t method,
                                 uint16_t respCode, EventID eventID) {
   if (method == 0 || message.empty()) {
-    platform_.counters.add(Reason::notForThisBackEnd);
+    platform().counters.add(Reason::notForThisBackEnd);
     return {};
   }
   Dictionary entry = message;
   entry.set("method", unsigned{method});
   entry.set("respCode", unsigned{respCode});
   entry.set("event", static_cast<unsigned>(eventID));
-  platform_.powerLog.registeredEvent(kAgent, kEventName, entry);
+  platform().powerLog.registeredEvent(kAgent, kEventName, entry);
   return {};
 }
 

@@ -13,16 +13,14 @@ namespace kyt {
 class AmpyxBackend : public KYTReportingBackend {
  public:
   static std::shared_ptr<AmpyxBackend> initWithName(Configuration& configuration, String name,
-                                                    Dictionary profile, std::optional<String> productFamily);
+                                                    Dictionary profile, SharedSessionFacts facts);
+  using KYTReportingBackend::KYTReportingBackend;
 
   // Only this operation, deliberately, and not the one with a flag that routed events go through: those reach
   // the base, which does nothing. A device would otherwise write a power-log entry for each event.
   using KYTReportingBackend::sendMessage;
   Value sendMessage(const Dictionary& message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID) override;
-
- protected:
-  using KYTReportingBackend::KYTReportingBackend;
 };
 
 }  // namespace kyt

@@ -27,6 +27,11 @@ const String* textOf(const Dictionary& profile, const char* key) {
   return value != nullptr ? value->string() : nullptr;
 }
 
+std::optional<String> entryOf(const std::optional<Dictionary>& profile, const char* key) {
+  const String* text = profile ? textOf(*profile, key) : nullptr;
+  return text != nullptr ? std::optional(*text) : std::nullopt;
+}
+
 bool has(const Dictionary& profile, const char* key) {
   const Value* value = profile.find(key);
   return value != nullptr && !value->isNull();
@@ -46,34 +51,29 @@ uint32_t addressOf(const String& text) {
 
 std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
                                                                  const std::optional<Dictionary>& profile,
-                                                                 const std::optional<String>& productFamily) {
+                                                                 const SharedSessionFacts& facts) {
   std::optional<String> serverIP;
   uint16_t serverPort = 0;
   if (profile) {
     if (const String* ip = textOf(*profile, "ip")) serverIP = *ip;
     serverPort = portOf(*profile);
   }
-  return initWithName(platform, name, profile, serverIP, serverPort, productFamily);
+  return initWithName(platform, name, profile, serverIP, serverPort, facts);
 }
 
 std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
                                                                  const std::optional<String>& serverIP,
                                                                  uint16_t serverPort,
-                                                                 const std::optional<String>& productFamily) {
+                                                                 const SharedSessionFacts& facts) {
   if (!serverIP) return nullptr;
-  return initWithName(platform, name, std::nullopt, serverIP, serverPort, productFamily);
+  return initWithName(platform, name, std::nullopt, serverIP, serverPort, facts);
 }
 
 std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platform, const String& name,
                                                                  const std::optional<Dictionary>& profile,
                                                                  const std::optional<String>& serverIP,
                                                                  uint16_t serverPort,
-                                                                 const std::optional<String>& productFamily) {
-  struct Made final : DashboardBackend {
-    Made(Platform& p, const String& n, const std::optional<Dictionary>& d, const std::optional<String>& f,
-         std::unique_ptr<UDPSocket> s)
-        : DashboardBackend(p, n, d, f, std::move(s)) {}
-  };
+                                                                 const SharedSessionFacts& facts) {
   if (profile && textOf(*profile, "ip") == nullptr) {
     platform.log.error("DashboardBackend(initWithName): can't resolve server IP");
     return nullptr;
@@ -87,8 +87,8 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
     platform.log.error("DashboardBackend(initWithName): socket() failed (%d)", *number);
     return nullptr;
   }
-  auto backend = std::make_shared<Made>(platform, name, profile, productFamily,
-                                        std::get<std::unique_ptr<UDPSocket>>(std::move(opened)));
+  auto backend = std::make_shared<DashboardBackend>(Making(), platform, name, profile, facts,
+                                                    std::get<std::unique_ptr<UDPSocket>>(std::move(opened)));
   // On the network queue: a datagram that comes from anywhere before all is in place waits there until it is.
   const bool started =
       backend->networkProcQueue_->sync([&] { return backend->start(profile, serverIP, serverPort); });
@@ -97,17 +97,21 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
   return backend;
 }
 
-DashboardBackend::DashboardBackend(Platform& platform, String name, const std::optional<Dictionary>& profile,
-                                   std::optional<String> productFamily, std::unique_ptr<UDPSocket> socket)
-    : KYTReportingBackend(platform, std::move(name), profile.value_or(Dictionary()),
-                          std::move(productFamily)),
+DashboardBackend::DashboardBackend(Making making, Platform& platform, String name,
+                                   const std::optional<Dictionary>& profile, SharedSessionFacts facts,
+                                   std::unique_ptr<UDPSocket> socket)
+    : KYTReportingBackend(making, platform, std::move(name), profile.value_or(Dictionary()),
+                          std::move(facts)),
       networkProcQueue_(SerialQueue::create("com.vantu.KYTReporting.networkProc", platform.executor)),
+      postURL_(entryOf(profile, "post_url")),
       period_(kDefaultPeriod),
-      socket_(std::move(socket)) {}
+      socket_(std::move(socket)) {
+  if (std::optional<String> url = entryOf(profile, "display_url")) setDisplayURL(std::move(url));
+}
 
 DashboardBackend::~DashboardBackend() {
   // What was handed over runs with a reference, so nobody else is here any more.
-  platform_.counters.add(Reason::datagramGivenUp, messageQueue_.size());
+  platform().counters.add(Reason::datagramGivenUp, messageQueue_.size());
 }
 
 bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
@@ -123,16 +127,16 @@ bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std
     address = addressOf(*serverIP);
     useReliableUDP();
   } else {
-    platform_.log.error("DashboardBackend(initWithName): initWitName with all null params.");
+    platform().log.error("DashboardBackend(initWithName): initWitName with all null params.");
     return false;
   }
   if (socket_->connect(address, port) != 0) {
-    platform_.log.error("DashboardBackend(initWithName): socket connect() failed.");
+    platform().log.error("DashboardBackend(initWithName): socket connect() failed.");
     return false;
   }
   forgetWhatCameEarlier();
   if (startTimer()) return true;
-  platform_.log.error("DashboardBackend(initWithName): can't create timer source.");
+  platform().log.error("DashboardBackend(initWithName): can't create timer source.");
   return false;
 }
 
@@ -146,8 +150,6 @@ void DashboardBackend::forgetWhatCameEarlier() {
 
 void DashboardBackend::readProfile(const Dictionary& profile) {
   usingProfile_ = true;
-  if (const String* url = textOf(profile, "display_url")) displayURL_ = *url;
-  if (const String* url = textOf(profile, "post_url")) postURL_ = *url;
   if (!has(profile, "reliable")) return;
   useReliableUDP();
   period_ = std::chrono::milliseconds(std::max(profile.find("reliable")->intValue(), kShortestPeriod));
@@ -156,7 +158,7 @@ void DashboardBackend::readProfile(const Dictionary& profile) {
 bool DashboardBackend::startTimer() {
   std::weak_ptr<KYTReportingBackend> weak = weak_from_this();
   // More leeway than half a short period would lose ticks.
-  timer_ = platform_.timers.every(
+  timer_ = platform().timers.every(
       period_, std::min(kLeeway, period_ / 2), networkProcQueue_, [weak = std::move(weak)] {
         if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->myPeriodicTask();
       });
@@ -182,17 +184,17 @@ String DashboardBackend::sanitize(const String& text) {
 DashboardDatagram::Header DashboardBackend::headerFor(const TimeValue& timestamp, uint16_t method,
                                                       uint16_t respCode, EventID eventID) const {
   DashboardDatagram::Header header;
-  header.selfVersionMajor = selfVersionMajor_;
-  header.clientType = static_cast<uint8_t>(compType_);
+  header.selfVersionMajor = facts().selfVersion[0];
+  header.clientType = static_cast<uint8_t>(facts().compType);
   header.time = timestamp;
-  header.sessionID = sessionID_;
-  header.clientVersion = clientVersion_;
+  header.sessionID = facts().sessionID;
+  header.clientVersion = facts().clientVersion;
   header.method = method;
   header.respCode = respCode;
   header.eventID = static_cast<uint16_t>(eventID);
   header.flags = static_cast<uint16_t>((reliableUDP_ ? DashboardDatagram::kFlagReliable : 0) |
                                        (usingProfile_ ? 0 : DashboardDatagram::kFlagWithoutProfile));
-  header.udid = udid_ != nullptr ? udid_ : "";
+  header.udid = facts().udid ? facts().udid->c_str() : "";
   return header;
 }
 
@@ -219,8 +221,8 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
                                     uint16_t respCode, EventID eventID) {
   std::unique_ptr<DashboardDatagram> datagram(new (std::nothrow) DashboardDatagram);
   if (datagram == nullptr) {
-    platform_.log.error("DashboardBackend(sendMessage): can't malloc.");
-    platform_.counters.add(Reason::datagramGivenUp);
+    platform().log.error("DashboardBackend(sendMessage): can't malloc.");
+    platform().counters.add(Reason::datagramGivenUp);
     return {};
   }
   datagram->fill(headerFor(timestamp, method, respCode, eventID));

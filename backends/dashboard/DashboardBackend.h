@@ -39,16 +39,16 @@ class DashboardBackend : public KYTReportingBackend {
   // left then. Without a profile (null, not empty) delivery is always reliable.
   static std::shared_ptr<DashboardBackend> initWithName(Platform& platform, const String& name,
                                                         const std::optional<Dictionary>& profile,
-                                                        const std::optional<String>& productFamily);
+                                                        const SharedSessionFacts& facts);
   static std::shared_ptr<DashboardBackend> initWithName(Platform& platform, const String& name,
                                                         const std::optional<String>& serverIP,
-                                                        uint16_t serverPort,
-                                                        const std::optional<String>& productFamily);
+                                                        uint16_t serverPort, const SharedSessionFacts& facts);
   static std::shared_ptr<DashboardBackend> initWithName(Platform& platform, const String& name,
                                                         const std::optional<Dictionary>& profile,
                                                         const std::optional<String>& serverIP,
-                                                        uint16_t serverPort,
-                                                        const std::optional<String>& productFamily);
+                                                        uint16_t serverPort, const SharedSessionFacts& facts);
+  DashboardBackend(Making, Platform& platform, String name, const std::optional<Dictionary>& profile,
+                   SharedSessionFacts facts, std::unique_ptr<UDPSocket> socket);
   ~DashboardBackend() override;
 
   using KYTReportingBackend::sendMessage;
@@ -85,12 +85,6 @@ class DashboardBackend : public KYTReportingBackend {
   [[nodiscard]] bool usingProfile() const { return usingProfile_; }
   [[nodiscard]] const std::optional<String>& postURL() const { return postURL_; }
 
- protected:
-  DashboardBackend(Platform& platform, String name, const std::optional<Dictionary>& profile,
-                   std::optional<String> productFamily, std::unique_ptr<UDPSocket> socket);
-
-  std::optional<String> postURL_;  // constant after the making
-
  private:
   // The making after the socket is open, on the network queue; false after a failure, which is logged.
   [[nodiscard]] bool start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
@@ -111,7 +105,8 @@ class DashboardBackend : public KYTReportingBackend {
   [[nodiscard]] bool finishUpload(const std::optional<Data>& reply, const std::optional<Error>& error);
 
   // Constant after the making.
-  std::shared_ptr<SerialQueue> networkProcQueue_;
+  const std::shared_ptr<SerialQueue> networkProcQueue_;
+  const std::optional<String> postURL_;
   bool reliableUDP_ = false;
   bool usingProfile_ = false;
   Duration period_;

@@ -21,12 +21,12 @@ constexpr int kLastResortMilliseconds = 9500;
 
 void DashboardBackend::useReliableUDP() {
   if (const int number = socket_->bindToAnyPort(); number != 0) {
-    platform_.log.error("DashboardBackend(useReliableUDP): can't bind socket, %d", number);
+    platform().log.error("DashboardBackend(useReliableUDP): can't bind socket, %d", number);
     return;
   }
   reliableUDP_ = true;
   // Reported once for each time that it is armed, so that the reactor does not spin while the queue waits.
-  readSource_ = platform_.reactor.watch(
+  readSource_ = platform().reactor.watch(
       socket_->descriptor(), ready::readable | ready::oneShot,
       [weak = weak_from_this(), queue = networkProcQueue_](unsigned) {
         queue->async([weak] {
@@ -34,7 +34,7 @@ void DashboardBackend::useReliableUDP() {
             self->processSocketRead();
         });
       });
-  if (!readSource_) platform_.log.error("DashboardBackend(useReliableUDP): can't create read source");
+  if (!readSource_) platform().log.error("DashboardBackend(useReliableUDP): can't create read source");
 }
 
 bool DashboardBackend::send(std::span<const std::byte> datagram) {
@@ -51,7 +51,7 @@ void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID e
   messageQueue_.push_back(std::move(packet));
   if (messageQueue_.size() <= kMaxPackets) return;
   messageQueue_.pop_front();
-  platform_.counters.add(Reason::datagramDisplaced);
+  platform().counters.add(Reason::datagramDisplaced);
 }
 
 void DashboardBackend::processSocketRead() {
@@ -75,7 +75,7 @@ void DashboardBackend::processSocketRead() {
 bool DashboardBackend::checkWaiting(UDPPacketToSend& packet) {
   const int32_t retransmits = packet.numberOfRetransmits();
   if (retransmits >= kMaxRetransmits) {
-    platform_.counters.add(Reason::datagramUnacknowledged);
+    platform().counters.add(Reason::datagramUnacknowledged);
     return true;
   }
   const int32_t checks = packet.numberOfChecks() + 1;
@@ -111,7 +111,7 @@ void DashboardBackend::myPeriodicTask() {
   }
   if (cleanupState_ == kRunning) return;
   if (messageQueue_.empty()) {
-    platform_.log.normal("DashboardBackend(myPeriodicTask): clean up at myPeriodicTask.");
+    platform().log.normal("DashboardBackend(myPeriodicTask): clean up at myPeriodicTask.");
     cleanupSources();
   } else if (cleanupState_ == kCleaningUp) {
     scheduleLastResort();
@@ -120,10 +120,10 @@ void DashboardBackend::myPeriodicTask() {
 
 void DashboardBackend::scheduleLastResort() {
   cleanupState_ = kLastResortScheduled;
-  platform_.log.normal("DashboardBackend(myPeriodicTask): scheduled last resort clean-up in %d ms.",
-                       kLastResortMilliseconds);
+  platform().log.normal("DashboardBackend(myPeriodicTask): scheduled last resort clean-up in %d ms.",
+                        kLastResortMilliseconds);
   if (lastResort_) return;  // a second clean-up does not put off the end that the first one set
-  lastResort_ = platform_.timers.after(
+  lastResort_ = platform().timers.after(
       std::chrono::milliseconds(kLastResortMilliseconds), networkProcQueue_, [weak = weak_from_this()] {
         if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->cleanupSources();
       });
@@ -147,7 +147,7 @@ void DashboardBackend::cleanupSources() {
   timer_.cancel();
   readSource_.cancel();
   socket_.reset();
-  platform_.counters.add(Reason::datagramGivenUp, messageQueue_.size());
+  platform().counters.add(Reason::datagramGivenUp, messageQueue_.size());
   messageQueue_.clear();
 }
 

@@ -11,12 +11,12 @@ namespace kyt {
 
 bool DashboardBackend::uploadLogData(const Value& logData) {
   if (!postURL_) {
-    platform_.log.error("DashboardBackend(uploadLogData): Post URL for log data array is nil");
+    platform().log.error("DashboardBackend(uploadLogData): Post URL for log data array is nil");
     return false;
   }
   std::optional<Data> body = archivedData(logData);
   if (!body) {
-    platform_.log.error("DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
+    platform().log.error("DashboardBackend(uploadLogData): Failed to serialize log data array for upload");
     return false;
   }
   URLRequest request;
@@ -25,11 +25,11 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.headers = {{"Content-Type", "application/octet-stream"}};
   request.body = std::move(*body);
   request.isAwaited = true;
-  request.account = userAccount_;
+  request.account = userAccount();
   const auto poster = connectivityDelegate();
   // Deliberately a success: the session is ending, and its client is not told that something is wrong.
   if (poster == nullptr) {
-    platform_.counters.add(Reason::postWithoutPoster);
+    platform().counters.add(Reason::postWithoutPoster);
     return true;
   }
 
@@ -50,17 +50,17 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
 // The status is deliberately not looked at: any body is taken for the location.
 bool DashboardBackend::finishUpload(const std::optional<Data>& reply, const std::optional<Error>& error) {
   if (error || !reply) {
-    platform_.counters.add(Reason::postFailed);
-    platform_.log.error("DashboardBackend(uploadLogData): Error uploading log data array (%s)",
-                        error ? error->localizedDescription.c_str() : "(null)");
+    platform().counters.add(Reason::postFailed);
+    platform().log.error("DashboardBackend(uploadLogData): Error uploading log data array (%s)",
+                         error ? error->localizedDescription.c_str() : "(null)");
     return false;
   }
   // What is no text is no location, but taken all the same.
   const Value location = isValidUTF8(reply->view()) ? Value(String(reply->view())) : Value();
-  platform_.log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s",
-                       description(location).c_str());
+  platform().log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s",
+                        description(location).c_str());
   // Numbered like every event, but not sent: it ends in the base's operation that does nothing.
-  sendMessage({{"LogDataUploadLocation", location}}, platform_.clock.timeOfDay(), 0, 2, MessageFlag{0});
+  sendMessage({{"LogDataUploadLocation", location}}, platform().clock.timeOfDay(), 0, 2, MessageFlag{0});
   return true;
 }
 

@@ -25,29 +25,26 @@ Value numberOrMinusOne(Value number) {
 std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(Configuration& configuration,
                                                                  const std::optional<String>& name,
                                                                  const std::optional<Dictionary>& profile,
-                                                                 std::optional<String> productFamily) {
-  struct Made final : HTTPSPostBackend {
-    Made(Configuration& c, String n, Dictionary p, std::optional<String> f)
-        : HTTPSPostBackend(c, std::move(n), std::move(p), std::move(f)) {}
-  };
+                                                                 SharedSessionFacts facts) {
   if (!name || !profile) return nullptr;
   const Value* clients = profile->find("clients");
   if (clients == nullptr || !clients->isArray()) {
     configuration.platform.log.error("HTTPSPostBackend(initWithName): can't find the client list.");
     return nullptr;
   }
-  return std::make_shared<Made>(configuration, *name, *profile, std::move(productFamily));
+  return std::make_shared<HTTPSPostBackend>(Making(), configuration, *name, *profile, std::move(facts));
 }
 
-HTTPSPostBackend::HTTPSPostBackend(Configuration& configuration, String name, Dictionary profile,
-                                   std::optional<String> productFamily)
-    : KYTReportingBackend(configuration.platform, std::move(name), std::move(profile),
-                          std::move(productFamily)),
-      configuration_(configuration) {
+HTTPSPostBackend::HTTPSPostBackend(Making making, Configuration& configuration, String name,
+                                   Dictionary profile, SharedSessionFacts facts)
+    : KYTReportingBackend(making, configuration.platform, std::move(name), std::move(profile),
+                          std::move(facts)),
+      configuration_(configuration),
+      reportVersion_(formattedReportVersion()) {
   readUserDefaults();
-  if (const Value* displayURL = profile_.find("display_url"); displayURL != nullptr)
-    if (const String* text = displayURL->string()) displayURL_ = *text;
-  dnuEnabled_ = platform_.consent.isSubmissionAllowed();
+  if (const Value* displayURL = this->profile().find("display_url"); displayURL != nullptr)
+    if (const String* text = displayURL->string()) setDisplayURL(*text);
+  dnuEnabled_ = platform().consent.isSubmissionAllowed();
   uuidRespectDnu_ = getPersistentIdentifierForDNU(true);
   uuidOverrideDnu_ = getPersistentIdentifierForDNU(false);
 }
@@ -57,26 +54,26 @@ HTTPSPostBackend::~HTTPSPostBackend() {
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
   giveBackToUser(batchedBytes_);
   if (!batchedEvents_) return;
-  platform_.counters.add(Reason::batchDiscarded, batchedEvents_->size());
+  platform().counters.add(Reason::batchDiscarded, batchedEvents_->size());
   tellDiscarded(batchedEvents_->size(),
-                requireUserInfo_ && !hasUserInfo() ? "user information was promised and is missing"
-                : state_ == kBackendStateEnabled
+                facts().requireUserInfo && !hasUserInfo() ? "user information was promised and is missing"
+                : stateOnQueue() == kBackendStateEnabled
                     ? "a single message was batched, since its client entry has \"expedite\" 0"
                     : "the back end was not enabled");
 }
 
 void HTTPSPostBackend::readUserDefaults() {
-  UserDefaults& defaults = platform_.userDefaults;
+  UserDefaults& defaults = platform().userDefaults;
   const Value post = defaults.value(kKYTReportingDefaultsDomain, "httpsPostURL");
   if (const String* url = post.string()) {
-    platform_.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for postURL", url->c_str());
+    platform().log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for postURL", url->c_str());
     postURL_ = *url;
     useDefaultPostURL_ = true;
   }
   const Value realtime = defaults.value(kKYTReportingDefaultsDomain, "httpsRealtimePostURL");
   if (const String* url = realtime.string()) {
-    platform_.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL",
-                        url->c_str());
+    platform().log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL",
+                         url->c_str());
     realtimePostURL_ = *url;
     useDefaultRealtimePostURL_ = true;
   }
@@ -84,7 +81,7 @@ void HTTPSPostBackend::readUserDefaults() {
 }
 
 const String* HTTPSPostBackend::userInfoText(const char* key) const {
-  const Value* value = userInfoDict_ ? userInfoDict_->find(key) : nullptr;
+  const Value* value = userInfoDict() ? userInfoDict()->find(key) : nullptr;
   return value != nullptr ? value->string() : nullptr;
 }
 
@@ -93,25 +90,25 @@ Dictionary HTTPSPostBackend::takePayload(Dictionary& message) const {
   if (!message.contains(kKYTReportingMessageBlobClientData)) return message;
   Value clientData = message.take(kKYTReportingMessageBlobClientData);
   if (Dictionary* payload = clientData.mutableDictionary()) return std::move(*payload);
-  platform_.log.error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
+  platform().log.error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
   return {};
 }
 
 void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
-  platform_.log.debug(
+  platform().log.debug(
       "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
   payload.set("Opt", dnuType_);
   payload.set("SamplingThreshold", numberOrMinusOne(samplingThreshold()));
   payload.set("OverrideSampling", numberOrMinusOne(overrideSampling_));
-  payload.set("Batch", batchEvents_ ? 1u : 0u);
+  payload.set("Batch", batchEvents() ? 1u : 0u);
 }
 
 Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                                     uint16_t respCode, EventID, MessageFlag flag) {
-  const Shared now = stateQueue().sync([this] { return Shared{state_, combinedSessionID_}; });
+  const Shared now = stateQueue().sync([this] { return Shared{stateOnQueue(), combinedSessionIDOnQueue()}; });
   const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
-    platform_.counters.add(Reason::eventDroppedByState);
+    platform().counters.add(Reason::eventDroppedByState);
     return {};
   }
   Dictionary payload = takePayload(message);
@@ -125,11 +122,11 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
   prepareEventForMessage(record, frameworkData);
   // This message is deliberately still handled with the old state: it is the last of the batch that it frees.
   if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled);
-  platform_.log.debug("HTTPSPostBackend(sendMessage): realtime is %d", isRealtime(flag));
+  platform().log.debug("HTTPSPostBackend(sendMessage): realtime is %d", isRealtime(flag));
   const bool undecided = oldState == kBackendStateUndecided || oldState == kBackendStateHeld;
-  if (undecided || (!isRealtime(flag) && batchEvents_) || (requireUserInfo_ && !hasUserInfo())) {
-    platform_.log.debug("HTTPSPostBackend(sendMessage): Batching %d, %d, %d", oldState, batchEvents_,
-                        requireUserInfo_);
+  if (undecided || (!isRealtime(flag) && batchEvents()) || (facts().requireUserInfo && !hasUserInfo())) {
+    platform().log.debug("HTTPSPostBackend(sendMessage): Batching %d, %d, %d", oldState, batchEvents(),
+                         facts().requireUserInfo);
     return batchEvent(std::move(record));
   }
   return sendStandalone(std::move(record), oldState, method, respCode, flag);
@@ -140,12 +137,12 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
   Value flushed;
   if (state == kBackendStateEnabled && isRealtime(flag) &&
       stateQueue().sync([this] { return batchedEvents_.has_value(); })) {
-    platform_.log.debug(
+    platform().log.debug(
         "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here to keep events in order.");
     flushed = flushMessagesWithCompletion(nullptr);
   }
-  platform_.log.debug("HTTPSPostBackend(sendMessage): Sending %d, %d, %d", state, batchEvents_,
-                      requireUserInfo_);
+  platform().log.debug("HTTPSPostBackend(sendMessage): Sending %d, %d, %d", state, batchEvents(),
+                       facts().requireUserInfo);
   Array records;
   records.append(Value(std::move(record)));
   Value text;

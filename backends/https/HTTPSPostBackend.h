@@ -35,7 +35,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   static std::shared_ptr<HTTPSPostBackend> initWithName(Configuration& configuration,
                                                         const std::optional<String>& name,
                                                         const std::optional<Dictionary>& profile,
-                                                        std::optional<String> productFamily);
+                                                        SharedSessionFacts facts);
+  HTTPSPostBackend(Making, Configuration& configuration, String name, Dictionary profile,
+                   SharedSessionFacts facts);
   ~HTTPSPostBackend() override;
 
   using KYTReportingBackend::sendMessage;
@@ -85,10 +87,6 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] bool shouldUseWiFiOnly() const { return shouldUseWiFiOnly_; }
   [[nodiscard]] bool immutable() const { return immutable_; }
 
- protected:
-  HTTPSPostBackend(Configuration& configuration, String name, Dictionary profile,
-                   std::optional<String> productFamily);
-
  private:
   enum class BatchTaking { nothing, discarded, userInfoMissing, taken };
   struct Shared {  // what other sessions may change
@@ -101,7 +99,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   };
 
   void readUserDefaults();
-  [[nodiscard]] bool hasUserInfo() const { return userInfoDict_ && !userInfoDict_->empty(); }
+  [[nodiscard]] bool hasUserInfo() const { return userInfoDict() && !userInfoDict()->empty(); }
   [[nodiscard]] const String* userInfoText(const char* key) const;
 
   // The road of one event.
@@ -150,9 +148,10 @@ class HTTPSPostBackend : public KYTReportingBackend {
                                       std::optional<uint16_t> responseCode) const;
   [[nodiscard]] std::string digestOfBody(const Data& body) const;
   [[nodiscard]] std::string versionSuffix() const;
-  [[nodiscard]] const String& reportVersion() const;
+  [[nodiscard]] String formattedReportVersion() const;
 
-  Configuration configuration_;
+  const Configuration configuration_;
+  const String reportVersion_;  // as records show it
 
   // Constant after initWithName.
   bool dnuEnabled_ = false;  // the user's consent to diagnostics-and-usage upload
@@ -174,10 +173,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   std::optional<String> uuidCustom_;
   // The custom identifiers of this object's life by their keys: one that cannot be stored must not change.
   std::vector<std::pair<std::string, String>> madeIdentifiers_;
-  bool immutable_ = false;        // once set, the state is no longer decided anew
-  size_t jsonSizeHint_ = 0;       // size of the last message
-  mutable String reportVersion_;  // as records show it
-  mutable std::optional<std::array<uint8_t, 3>> reportVersionOf_;
+  bool shouldUseWiFiOnly_ = false;
+  bool immutable_ = false;   // once set, the state is no longer decided anew
+  size_t jsonSizeHint_ = 0;  // size of the last message
 
   // The state queue.
   std::optional<Array> batchedEvents_;

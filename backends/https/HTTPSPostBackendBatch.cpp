@@ -62,7 +62,7 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
   });
   Value flushed;
   if (count > eventThreshold_) {
-    platform_.log.debug(
+    platform().log.debug(
         "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method %d",
         method);
     flushed = flushMessagesWithCompletion(nullptr);
@@ -70,7 +70,7 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
     batched = stateQueue().sync([this] { return batchedBytes_; });  // a flush may have kept the batch
   }
   const uint64_t bytes = roughSize(record);
-  const bool fits = batched + bytes <= platform_.limits.maxBatchBytes;
+  const bool fits = batched + bytes <= platform().limits.maxBatchBytes;
   if (!fits || !takeFromUser(bytes)) {
     fits ? countDroppedByUser() : countDroppedByLimit();
     // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
@@ -86,31 +86,32 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
 }
 
 void HTTPSPostBackend::countDroppedByLimit() const {
-  if (!platform_.counters.addAndMayLog(Reason::batchFull, platform_.clock.monotonic())) return;
-  platform_.log.error(
+  if (!platform().counters.addAndMayLog(Reason::batchFull, platform().clock.monotonic())) return;
+  platform().log.error(
       "HTTPSPostBackend(batchEvent): the batch of backend %s is full (%llu bytes), dropping events",
-      name_.c_str(), static_cast<unsigned long long>(platform_.limits.maxBatchBytes));
+      name().c_str(), static_cast<unsigned long long>(platform().limits.maxBatchBytes));
 }
 
 bool HTTPSPostBackend::takeFromUser(uint64_t bytes) const {
-  return userAccount_ == nullptr || userAccount_->take(Share::bytes, bytes, kLeftForMessages);
+  return userAccount() == nullptr || userAccount()->take(Share::bytes, bytes, kLeftForMessages);
 }
 
 void HTTPSPostBackend::giveBackToUser(uint64_t bytes) const {
-  if (userAccount_ != nullptr) userAccount_->giveBack(Share::bytes, bytes);
+  if (userAccount() != nullptr) userAccount()->giveBack(Share::bytes, bytes);
 }
 
 void HTTPSPostBackend::countDroppedByUser() const {
-  if (!platform_.counters.addAndMayLog(Reason::userBatchesFull, platform_.clock.monotonic())) return;
-  platform_.log.error("HTTPSPostBackend(batchEvent): user %u holds %llu bytes, dropping events of backend %s",
-                      userAccount_->user(),
-                      static_cast<unsigned long long>(userAccount_->holds(Share::bytes)), name_.c_str());
+  if (!platform().counters.addAndMayLog(Reason::userBatchesFull, platform().clock.monotonic())) return;
+  platform().log.error(
+      "HTTPSPostBackend(batchEvent): user %u holds %llu bytes, dropping events of backend %s",
+      userAccount()->user(), static_cast<unsigned long long>(userAccount()->holds(Share::bytes)),
+      name().c_str());
 }
 
 HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records, uint64_t& bytes) {
   if (!batchedEvents_) return BatchTaking::nothing;
-  const bool enabled = state_ == kBackendStateEnabled;
-  if (enabled && requireUserInfo_ && !hasUserInfo()) return BatchTaking::userInfoMissing;
+  const bool enabled = stateOnQueue() == kBackendStateEnabled;
+  if (enabled && facts().requireUserInfo && !hasUserInfo()) return BatchTaking::userInfoMissing;
   writeSessionIDOnQueue();
   records = std::move(*batchedEvents_);
   batchedEvents_.reset();
@@ -121,11 +122,11 @@ HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records,
 }
 
 void HTTPSPostBackend::tellDiscarded(size_t events, const char* why) const {
-  if (!platform_.counters.mayTell(Reason::batchDiscarded, why + std::to_string(compType()),
-                                  platform_.clock.monotonic()))
+  if (!platform().counters.mayTell(Reason::batchDiscarded, why + std::to_string(facts().compType),
+                                   platform().clock.monotonic()))
     return;
-  platform_.log.normal("HTTPSPostBackend(flushMessages): %s discards %zu events of client type %d: %s",
-                       name_.c_str(), events, compType(), why);
+  platform().log.normal("HTTPSPostBackend(flushMessages): %s discards %zu events of client type %d: %s",
+                        name().c_str(), events, facts().compType, why);
 }
 
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
@@ -134,8 +135,8 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   switch (stateQueue().sync([&] { return takeBatchOnQueue(batch, bytes); })) {
     case BatchTaking::discarded:
       giveBackToUser(bytes);
-      platform_.counters.add(Reason::batchDiscarded, batch.size());
-      if (requireUserInfo_ && !hasUserInfo())
+      platform().counters.add(Reason::batchDiscarded, batch.size());
+      if (facts().requireUserInfo && !hasUserInfo())
         tellDiscarded(batch.size(), "user information was promised and is missing");
       [[fallthrough]];
     case BatchTaking::nothing:
@@ -147,7 +148,7 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
     case BatchTaking::taken:
       break;
   }
-  platform_.log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
+  platform().log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   Array records = recordsToPost(std::move(batch), bytes);
   Value pretty;
   std::optional<std::string> json;
@@ -171,15 +172,15 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
 bool HTTPSPostBackend::admits(const Dictionary& record) const {
   const auto category = static_cast<uint16_t>(methodOf(record));
   if (!isWhitelistedEvent(category)) {
-    platform_.log.debug(
+    platform().log.debug(
         "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend %s",
-        category, name_.c_str());
+        category, name().c_str());
     return false;
   }
   if (isBlacklistedEvent(category)) {
-    platform_.log.debug(
+    platform().log.debug(
         "flushMessagesWithCompletion: Dropping event with category %d as it is blacklisted for backend %s",
-        category, name_.c_str());
+        category, name().c_str());
     return false;
   }
   return true;
@@ -191,9 +192,9 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
 // dropped.
 Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   Dictionary userInfo;
-  if (userInfoDict_) userInfo = *userInfoDict_;
+  if (userInfoDict()) userInfo = *userInfoDict();
   filterEvent(userInfo);
-  const uint64_t limit = platform_.limits.maxBatchBytes;
+  const uint64_t limit = platform().limits.maxBatchBytes;
   const bool mayOutgrow = bytes + batch.size() * roughSize(userInfo) > limit;
   uint64_t kept = 0;
   Array records;
@@ -202,7 +203,7 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   for (size_t i = 0; i < batch.size(); ++i) {
     Dictionary* record = values[i].mutableDictionary();
     if (!admits(*record)) {
-      platform_.counters.add(Reason::batchedEventFiltered);
+      platform().counters.add(Reason::batchedEventFiltered);
       continue;
     }
     record->merge(userInfo);
@@ -219,7 +220,7 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
 // meanwhile: the records wait until their own session takes or adds to them.
 void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
   stateQueue().sync([&] {
-    combinedSessionID_ = sessionID;
+    setCombinedSessionIDOnQueue(sessionID);
     if (!batchedEvents_) return;
     forgetSizesOnQueue();
     batchHasOldSessionID_ = true;
@@ -227,8 +228,8 @@ void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
 }
 
 void HTTPSPostBackend::writeSessionIDOnQueue() {
-  if (!std::exchange(batchHasOldSessionID_, false) || !batchedEvents_ || !combinedSessionID_) return;
-  const Value sessionID(combinedSessionID_->text());
+  if (!std::exchange(batchHasOldSessionID_, false) || !batchedEvents_ || !combinedSessionIDOnQueue()) return;
+  const Value sessionID(combinedSessionIDOnQueue()->text());
   Value* values = batchedEvents_->mutableBegin();
   for (size_t i = 0; i < batchedEvents_->size(); ++i)
     values[i].mutableDictionary()->set("_sessionID", sessionID);
@@ -240,7 +241,7 @@ uint64_t HTTPSPostBackend::batchedEventsSize() {
     writeSessionIDOnQueue();
     const size_t count = batchedEvents_ ? batchedEvents_->size() : 0;
     for (; sizedRecords_ < count; ++sizedRecords_)
-      sizeOfRecords_ += objectSizeEstimate((*batchedEvents_)[sizedRecords_], platform_.memory);
+      sizeOfRecords_ += objectSizeEstimate((*batchedEvents_)[sizedRecords_], platform().memory);
     return sizeOfRecords_;
   });
 }

@@ -101,8 +101,8 @@ void HTTPSPostBackend::removeUnpostable(Dictionary& record) const {
     if (const std::optional<Date> date = value.date())
       value = Value(finiteOrMinusOne(date->secondsSince1970));
     if (isPostable(value)) return false;
-    platform_.counters.add(Reason::valueNotPostable);
-    platform_.log.error(
+    platform().counters.add(Reason::valueNotPostable);
+    platform().log.error(
         "HTTPSPostBackend(createMessageForPostAndLogging): JSONWriter unable to handle key: %s, value: %s",
         key.c_str(), description(value).c_str());
     return true;
@@ -110,10 +110,7 @@ void HTTPSPostBackend::removeUnpostable(Dictionary& record) const {
 }
 
 std::optional<String> HTTPSPostBackend::clientID() const {
-  if (extrasOnInternal_ != 0 && isInternal_) {
-    if (udid_ == nullptr) return std::nullopt;
-    return String(udid_);
-  }
+  if (extrasOnInternal_ != 0 && facts().isInternal) return facts().udid;
   if (uuidCustom_) return uuidCustom_;
   return dnuType_ != 0 ? uuidOverrideDnu_ : uuidRespectDnu_;
 }
@@ -132,7 +129,7 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
   for (size_t i = 0; i < records.size(); ++i) removeUnpostable(*values[i].mutableDictionary());
   Dictionary entries;
   entries.reserve(3);
-  entries.append("postTime", finiteOrMinusOne(platform_.clock.timeOfDay().asSeconds()));
+  entries.append("postTime", finiteOrMinusOne(platform().clock.timeOfDay().asSeconds()));
   // Deliberately a list that ends at the first missing object: servers know that events never come without
   // a client ID, and that such a message carries its time alone.
   const std::optional<String> client = clientID();
@@ -141,16 +138,16 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
     entries.append("clientId", *client);
     entries.append("events", Value(std::move(records)));
   } else {
-    platform_.counters.add(Reason::postWithoutClientID, records.size());
+    platform().counters.add(Reason::postWithoutClientID, records.size());
   }
   const Value message(std::move(entries));
   std::string json;
   json.reserve(jsonSizeHint_ + jsonSizeHint_ / 8);
-  platform_.json.writeCompact(message, json);
+  platform().json.writeCompact(message, json);
   jsonSizeHint_ = json.size();
   if (prettyJSONString != nullptr && mayShowPrettyText()) {
     std::string pretty;
-    platform_.json.writePretty(message, pretty);
+    platform().json.writePretty(message, pretty);
     *prettyJSONString = Value(pretty);
   }
   return json;
@@ -167,7 +164,7 @@ std::string HTTPSPostBackend::addressWithForcedScheme(const String& url) const {
 }
 
 std::string HTTPSPostBackend::digestOfBody(const Data& body) const {
-  const auto digest = platform_.cryptography.hmacSHA1(digestKey_->bytes(), body.bytes());
+  const auto digest = platform().cryptography.hmacSHA1(digestKey()->bytes(), body.bytes());
   std::string text = "<";
   for (size_t i = 0; i < digest.size(); i += kDigestGroup) {
     if (i != 0) text += ' ';
@@ -178,7 +175,7 @@ std::string HTTPSPostBackend::digestOfBody(const Data& body) const {
 
 URLRequest HTTPSPostBackend::newRequest(std::string url, std::string json, std::optional<uint16_t> method,
                                         std::optional<uint16_t> responseCode) const {
-  std::optional<Data> body = gzipDeflate(platform_, std::as_bytes(std::span(json)));
+  std::optional<Data> body = gzipDeflate(platform(), std::as_bytes(std::span(json)));
   const bool compressed = body && !body->empty() && body->size() < json.size();
   if (!compressed) body = Data(std::string_view(json));
 
@@ -192,23 +189,25 @@ URLRequest HTTPSPostBackend::newRequest(std::string url, std::string json, std::
     header("X-KYT-Client-Name", name->str());
   if (const String* name = userInfoText(kKYTReportingUserInfoServiceName))
     header("X-KYT-Service-Name", name->str());
-  if (isInternal_) header("X-KYT-Internal-Build", "1");
-  header("User-Agent", formatObjects("KYTReporting/%d.%d%@ (%@; %@)",
-                                     {unsigned{selfVersionMajor_}, unsigned{selfVersionMiddle_},
-                                      versionSuffix(), hardwareType_ ? Value(*hardwareType_) : Value(),
-                                      productVersion_ ? Value(*productVersion_) : Value()}));
-  header("X-KYT-Client-Version", std::to_string(clientVersion_));
-  header("X-KYT-Sender", clientTypeShortCode(compType_));
+  if (facts().isInternal) header("X-KYT-Internal-Build", "1");
+  header("User-Agent",
+         formatObjects("KYTReporting/%d.%d%@ (%@; %@)",
+                       {unsigned{facts().selfVersion[0]}, unsigned{facts().selfVersion[1]}, versionSuffix(),
+                        facts().hardwareType ? Value(*facts().hardwareType) : Value(),
+                        facts().productVersion ? Value(*facts().productVersion) : Value()}));
+  header("X-KYT-Client-Version", std::to_string(facts().clientVersion));
+  header("X-KYT-Sender", clientTypeShortCode(facts().compType));
   if (method && responseCode)
     header("X-KYT-Event-Map", formatObjects("%@ %@", {unsigned{*method}, unsigned{*responseCode}}));
   header("Accept", "application/json");
   header("Content-Type", "application/json");
   header("Content-Length", std::to_string(body->size()));
   if (compressed) header("Content-Encoding", "gzip");
-  if (digestKey_ && digestAlgorithm_ == kDigestAlgorithmHMACSHA1) header("X-KYT-DIGEST", digestOfBody(*body));
+  if (digestKey() && digestAlgorithm() == kDigestAlgorithmHMACSHA1)
+    header("X-KYT-DIGEST", digestOfBody(*body));
   request.body = std::move(*body);
   request.allowsCellularAccess = !shouldUseWiFiOnly_;
-  request.account = userAccount_;
+  request.account = userAccount();
   return request;
 }
 
@@ -217,12 +216,12 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
                                        size_t events) {
   const std::optional<String>& url = isRealtime(flag) ? realtimePostURL_ : postURL_;
   if (!url) {
-    platform_.counters.add(Reason::postWithoutURL, events);
-    if (platform_.counters.mayTell(Reason::postWithoutURL, name_.str() + std::to_string(compType()),
-                                   platform_.clock.monotonic()))
-      platform_.log.normal(
+    platform().counters.add(Reason::postWithoutURL, events);
+    if (platform().counters.mayTell(Reason::postWithoutURL, name().str() + std::to_string(facts().compType),
+                                    platform().clock.monotonic()))
+      platform().log.normal(
           "HTTPSPostBackend(postJsonMessage): The storebag's %s has no post_url for client type %d: %zu events are lost",
-          name_.c_str(), compType(), events);
+          name().c_str(), facts().compType, events);
     if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
     return;
   }
@@ -230,13 +229,13 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
   const auto delegate = connectivityDelegate();
   // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
   if (delegate == nullptr) {
-    platform_.counters.add(Reason::postWithoutPoster, events);
+    platform().counters.add(Reason::postWithoutPoster, events);
     return;
   }
   std::string address = request.url.substr(0, request.url.find('?'));
   delegate->postURLRequestWithCompletionHandler(
-      std::move(request), Reply{weak_from_this(), platform_, name_, std::move(completion), events,
-                                std::move(address), userAccount_});
+      std::move(request), Reply{weak_from_this(), platform(), name(), std::move(completion), events,
+                                std::move(address), userAccount()});
 }
 
 }  // namespace kyt

@@ -70,18 +70,12 @@ class RecordWriter {
 
 // "." and the minor, or nothing when that is 0.
 std::string HTTPSPostBackend::versionSuffix() const {
-  return selfVersionMinor_ != 0 ? "." + std::to_string(selfVersionMinor_) : std::string();
+  return facts().selfVersion[2] != 0 ? "." + std::to_string(facts().selfVersion[2]) : std::string();
 }
 
-// Formatted when the version changes, not for every event.
-const String& HTTPSPostBackend::reportVersion() const {
-  const std::array<uint8_t, 3> version{selfVersionMajor_, selfVersionMiddle_, selfVersionMinor_};
-  if (!reportVersionOf_ || *reportVersionOf_ != version) {
-    reportVersion_ =
-        String(formatObjects("%u.%u%@", {unsigned{version[0]}, unsigned{version[1]}, versionSuffix()}));
-    reportVersionOf_ = version;
-  }
-  return reportVersion_;
+String HTTPSPostBackend::formattedReportVersion() const {
+  const std::array<uint8_t, 3>& version = facts().selfVersion;
+  return String(formatObjects("%u.%u%@", {unsigned{version[0]}, unsigned{version[1]}, versionSuffix()}));
 }
 
 Dictionary HTTPSPostBackend::newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
@@ -95,41 +89,42 @@ Dictionary HTTPSPostBackend::makeRecord(Dictionary payload, const TimeValue& tim
   const RecordKeys& keys = recordKeys();
   Dictionary record = std::move(payload);
   RecordWriter writer(record, mayHoldFixedKey(record));
-  record.reserve(record.size() + kFixedKeys + room + (userInfoDict_ ? userInfoDict_->size() : 0));
+  record.reserve(record.size() + kFixedKeys + room + (userInfoDict() ? userInfoDict()->size() : 0));
 
-  const int64_t startTS = Value(startTimeStamp_).longLongValue() / kSecondsPerMinute * kSecondsPerMinute;
+  const int64_t startTS =
+      Value(facts().startTimeStamp).longLongValue() / kSecondsPerMinute * kSecondsPerMinute;
   writer.set(keys.startTS, startTS);
-  writer.set(keys.sender, clientTypeShortCode(compType_));
-  writer.set(keys.clientVersion, static_cast<unsigned>(clientVersion_));
+  writer.set(keys.sender, clientTypeShortCode(facts().compType));
+  writer.set(keys.clientVersion, static_cast<unsigned>(facts().clientVersion));
   const bool numericSessionID =
-      compType_ == kClientTypeQH ||
-      (isInternal_ && (compType_ == kClientTypeQM || compType_ == kClientTypeQPRAV));
+      facts().compType == kClientTypeQH ||
+      (facts().isInternal && (facts().compType == kClientTypeQM || facts().compType == kClientTypeQPRAV));
   if (numericSessionID) {
-    writer.set(keys.sessionID, sessionID_);
+    writer.set(keys.sessionID, facts().sessionID);
   } else {
     writer.setWhenKnown(keys.sessionID, sessionID);
   }
-  writer.set(keys.eventNumber, static_cast<unsigned>(eventID_));
+  writer.set(keys.eventNumber, static_cast<unsigned>(eventNumber()));
   writer.set(keys.method, static_cast<unsigned>(method));
   writer.set(keys.status, static_cast<unsigned>(respCode));
   // The offset is added to the start cut to its minute, deliberately: records tell the session's course, not
   // when exactly it began.
-  double clientTS = static_cast<double>(startTS) + (timestamp.asSeconds() - startTimeStamp_);
+  double clientTS = static_cast<double>(startTS) + (timestamp.asSeconds() - facts().startTimeStamp);
   if (!std::isfinite(clientTS)) clientTS = -1.0;
   writer.set(keys.clientTS, clientTS);
   writer.set(keys.eventTime, clientTS);
-  writer.setWhenKnown(keys.productFamily, productFamily_);
-  writer.setWhenKnown(keys.productModel, hardwareType_);
-  writer.setWhenKnown(keys.osVersion, productVersion_);
-  writer.setWhenKnown(keys.build, buildVersion_);
+  writer.setWhenKnown(keys.productFamily, facts().productFamily);
+  writer.setWhenKnown(keys.productModel, facts().hardwareType);
+  writer.setWhenKnown(keys.osVersion, facts().productVersion);
+  writer.setWhenKnown(keys.build, facts().buildVersion);
   writer.set(keys.internal, configuration_.deviceIdentity.isInternalBuild() ? 1u : 0u);
-  writer.set(keys.reportVers, reportVersion());
-  writer.set(keys.timezoneOffset, platform_.deviceProperties.secondsFromGMT(platform_.clock.timeOfDay()));
+  writer.set(keys.reportVers, reportVersion_);
+  writer.set(keys.timezoneOffset, platform().deviceProperties.secondsFromGMT(platform().clock.timeOfDay()));
   return record;
 }
 
 void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const {
-  if (userInfoDict_) event.merge(*userInfoDict_);
+  if (userInfoDict()) event.merge(*userInfoDict());
   if (frameworkData != nullptr) event.merge(*frameworkData);
   filterEvent(event);
 }

@@ -81,8 +81,7 @@ bool HTTPSPostBackend::matchClientNameAndServiceID(const Dictionary& client, con
 bool HTTPSPostBackend::isFrameworkEnabledForClient(const Dictionary& client) const {
   const String* enabledSince = textEntry(client, "enabledSince");
   if (enabledSince == nullptr) return true;
-  return std::array<uint8_t, 3>{selfVersionMajor_, selfVersionMiddle_, selfVersionMinor_} >=
-         versionParts(*enabledSince);
+  return facts().selfVersion >= versionParts(*enabledSince);
 }
 
 bool HTTPSPostBackend::updatePostLink(const Dictionary& client) {
@@ -92,19 +91,19 @@ bool HTTPSPostBackend::updatePostLink(const Dictionary& client) {
     if (const String* url = textEntry(client, "post_url")) {
       postURL_ = *url;
       taken = true;
-      platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for postURL", url->c_str());
+      platform().log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for postURL", url->c_str());
     }
   }
   if (!useDefaultRealtimePostURL_ || !realtimePostURL_) {
     useDefaultRealtimePostURL_ = false;
     if (const String* url = textEntry(client, "realtime_post_url")) {
       realtimePostURL_ = *url;
-      platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for realtimePostURL",
-                          url->c_str());
+      platform().log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for realtimePostURL",
+                           url->c_str());
     } else {
       realtimePostURL_ = postURL_;
-      platform_.log.debug("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '%s'",
-                          shown(postURL_ ? &*postURL_ : nullptr).c_str());
+      platform().log.debug("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '%s'",
+                           shown(postURL_ ? &*postURL_ : nullptr).c_str());
     }
   }
   return taken;
@@ -112,9 +111,9 @@ bool HTTPSPostBackend::updatePostLink(const Dictionary& client) {
 
 void HTTPSPostBackend::resetBackendStateWithClient(const Dictionary* client) {
   eventThreshold_ = client != nullptr ? intEntry(*client, "event_threshold") : 0;
-  platform_.log.debug("resetBackendStateWithClient: event_threshold set to %d", eventThreshold_);
+  platform().log.debug("resetBackendStateWithClient: event_threshold set to %d", eventThreshold_);
   extrasOnInternal_ = client != nullptr ? intEntry(*client, "extras_on_internal") : 0;
-  platform_.log.debug("setBackendStateWithClient: extras on internal is set to %d", extrasOnInternal_);
+  platform().log.debug("setBackendStateWithClient: extras on internal is set to %d", extrasOnInternal_);
 }
 
 void HTTPSPostBackend::updateState() {
@@ -125,14 +124,14 @@ void HTTPSPostBackend::updateState() {
 
 int32_t HTTPSPostBackend::updateBackendState() {
   if (immutable_) return state();
-  const Array* clients = arrayEntry(profile_, "clients");
+  const Array* clients = arrayEntry(profile(), "clients");
   if (clients == nullptr) return kBackendStateDisabled;
   const Client client{userInfoText(kKYTReportingUserInfoClientName),
                       userInfoText(kKYTReportingUserInfoServiceName)};
   applyExpedite(*clients, client);
-  if (!requireUserInfo_) return enableWithoutUserInfo(*clients);
+  if (!facts().requireUserInfo) return enableWithoutUserInfo(*clients);
   if (!hasUserInfo()) return kBackendStateUndecided;
-  const std::optional<String> country = platform_.deviceProperties.countryCode();
+  const std::optional<String> country = platform().deviceProperties.countryCode();
   const Dictionary* entry = chosenEntry(*clients, client);
   if (entry == nullptr) tellWhyNot(Reason::clientNotListed, "no entry of the storebag is for this client");
   if (entry == nullptr || !passesRules(*entry, country ? &*country : nullptr)) return kBackendStateDisabled;
@@ -148,9 +147,9 @@ void HTTPSPostBackend::applyExpedite(const Array& clients, const Client& client)
     const Dictionary* entry = element.dictionary();
     if (entry == nullptr || !matchClientNameAndServiceID(*entry, client.name, client.service)) continue;
     if (entry->contains("expedite")) {
-      batchEvents_ = intEntry(*entry, "expedite") == 0;
-      platform_.log.debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d",
-                          batchEvents_);
+      setBatchEvents(intEntry(*entry, "expedite") == 0);
+      platform().log.debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d",
+                           batchEvents());
     }
     return;
   }
@@ -183,7 +182,7 @@ bool HTTPSPostBackend::passesRules(const Dictionary& entry, const String* countr
   if (!passesConsent(entry) || !passesLists(entry, country)) return false;
   const Array* filters = arrayEntry(entry, "filters");
   if (filters == nullptr) {
-    platform_.log.error("HTTPSPostBackend(updateBackendState): filters are required.");
+    platform().log.error("HTTPSPostBackend(updateBackendState): filters are required.");
     return false;
   }
   createFiltersFromArray(*filters);
@@ -198,13 +197,13 @@ bool HTTPSPostBackend::passesConsent(const Dictionary& entry) {
   }
   dnuType_ = 0;
   if (dnuEnabled_) return true;
-  platform_.log.debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.", overrideDnu);
+  platform().log.debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.", overrideDnu);
   tellWhyNot(Reason::consentMissing, "the user has not given consent");
   return false;
 }
 
 bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* country) const {
-  Log& log = platform_.log;
+  Log& log = platform().log;
   // The list is required, so it is matched by the rule that fails without one. By the same rule a device
   // whose country is not known passes: deliberate, servers count on hearing from those.
   const Array* locales = arrayEntry(entry, "locale_whitelist");
@@ -215,7 +214,7 @@ bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* countr
     tellWhyNot(Reason::countryNotListed, "the storebag's entry does not list this country");
     return false;
   }
-  const String* family = productFamily_ ? &*productFamily_ : nullptr;
+  const String* family = facts().productFamily ? &*facts().productFamily : nullptr;
   const Array* devices = arrayEntry(entry, "device_whitelist");
   if (!matchStringWithList(devices, family, true)) {
     if (log.debugEnabled())
@@ -224,7 +223,7 @@ bool HTTPSPostBackend::passesLists(const Dictionary& entry, const String* countr
     tellWhyNot(Reason::deviceNotListed, "the storebag's entry does not list this device");
     return false;
   }
-  const String* hardware = hardwareType_ ? &*hardwareType_ : nullptr;
+  const String* hardware = facts().hardwareType ? &*facts().hardwareType : nullptr;
   const Array* excluded = arrayEntry(entry, "device_blacklist");
   if (matchStringWithList(excluded, hardware, false)) {
     if (log.debugEnabled())
@@ -242,7 +241,7 @@ int32_t HTTPSPostBackend::decideBySampling(const Dictionary& entry, const String
   if (const Dictionary* forCountry = countrySampling(entry, country)) {
     const Value* replacement = forCountry->find("threshold");
     Value changed = replacement != nullptr ? *replacement : Value();
-    platform_.log.debug(
+    platform().log.debug(
         "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f",
         country->c_str(), asShown(threshold), asShown(changed));
     threshold = std::move(changed);
@@ -252,44 +251,44 @@ int32_t HTTPSPostBackend::decideBySampling(const Dictionary& entry, const String
     tellWhyNot(Reason::samplingThresholdMissing, "the storebag's entry has no sampling_threshold");
     return kBackendStateDisabled;
   }
-  if (samplingFactor_ <= threshold.doubleValue()) return kBackendStateEnabled;
+  if (samplingFactor() <= threshold.doubleValue()) return kBackendStateEnabled;
   tellWhyNot(Reason::sampledOut, "this session was not drawn");
   const Value* second = entry.find("override_sampling");
   overrideSampling_ = second != nullptr ? *second : Value();
   // "Greater than" and no other test: an override that is not a number holds the back end.
-  if (!overrideSampling_.isNull() && samplingFactor_ > overrideSampling_.doubleValue())
+  if (!overrideSampling_.isNull() && samplingFactor() > overrideSampling_.doubleValue())
     return kBackendStateDisabled;
   return kBackendStateHeld;
 }
 
 void HTTPSPostBackend::takeSettings(const Dictionary& entry, const Client& client, int32_t state) {
-  Log& log = platform_.log;
+  Log& log = platform().log;
   resetBackendStateWithClient(&entry);
   if (entry.contains("custom_clientId")) uuidCustom_ = getPersistentIdentifierForCustomClientIDSuffix(client);
   if (log.debugEnabled())
     log.debug("HTTPSPostBackend(updateBackendState): %s: client found %s:%s, state=%d, samplingFactor=%f",
-              name_.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), state,
-              samplingFactor_);
+              name().c_str(), shown(client.name).c_str(), shown(client.service).c_str(), state,
+              samplingFactor());
   updatePostLink(entry);
   if (const Array* list = arrayEntry(entry, "event_whitelist")) {
-    eventWhitelist_ = *list;
+    setEventWhitelist(*list);
     log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@",
-                     {Value(name_), Value(*list)});
+                     {Value(name()), Value(*list)});
   }
   if (const Array* list = arrayEntry(entry, "event_blacklist")) {
-    eventBlacklist_ = *list;
+    setEventBlacklist(*list);
     log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@",
-                     {Value(name_), Value(*list)});
+                     {Value(name()), Value(*list)});
   }
   shouldUseWiFiOnly_ = intEntry(entry, "use_wifi_only") != 0;
 }
 
 // Each decision's own line is at the debug level; whoever runs the device sees one a minute without it.
 void HTTPSPostBackend::tellWhyNot(Reason reason, const char* why) const {
-  if (!platform_.counters.addAndMayLog(reason, platform_.clock.monotonic())) return;
-  platform_.log.normal("HTTPSPostBackend(updateBackendState): %s posts nothing of %s:%s, since %s",
-                       name_.c_str(), shown(userInfoText(kKYTReportingUserInfoClientName)).c_str(),
-                       shown(userInfoText(kKYTReportingUserInfoServiceName)).c_str(), why);
+  if (!platform().counters.addAndMayLog(reason, platform().clock.monotonic())) return;
+  platform().log.normal("HTTPSPostBackend(updateBackendState): %s posts nothing of %s:%s, since %s",
+                        name().c_str(), shown(userInfoText(kKYTReportingUserInfoClientName)).c_str(),
+                        shown(userInfoText(kKYTReportingUserInfoServiceName)).c_str(), why);
 }
 
 String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Client& client) {
@@ -304,8 +303,8 @@ String HTTPSPostBackend::getPersistentIdentifierForCustomClientIDSuffix(const Cl
     if (madeIdentifiers_.size() >= kMostMadeIdentifiers) madeIdentifiers_.erase(madeIdentifiers_.begin());
     madeIdentifiers_.emplace_back(key, identifier);
   }
-  platform_.log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
-                       platform_.log.shownIdentifier(identifier).c_str());
+  platform().log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
+                        platform().log.shownIdentifier(identifier).c_str());
   return identifier;
 }
 

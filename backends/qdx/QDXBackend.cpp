@@ -27,21 +27,11 @@ bool QDXBackend::isClientTypeAllowed(int32_t clientType) {
 }
 
 std::shared_ptr<QDXBackend> QDXBackend::initWithName(Configuration& configuration, String name,
-                                                     Dictionary profile,
-                                                     std::optional<String> productFamily) {
-  return initWithName(configuration, std::move(name), std::move(profile), std::move(productFamily), 0);
-}
-
-std::shared_ptr<QDXBackend> QDXBackend::initWithName(Configuration& configuration, String name,
-                                                     Dictionary profile, std::optional<String> productFamily,
-                                                     int32_t clientType) {
-  struct Made final : QDXBackend {
-    Made(Platform& p, String n, Dictionary d, std::optional<String> f)
-        : QDXBackend(p, std::move(n), std::move(d), std::move(f)) {}
-  };
+                                                     Dictionary profile, SharedSessionFacts facts) {
   Log& log = configuration.platform.log;
-  auto backend = std::make_shared<Made>(configuration.platform, std::move(name), std::move(profile),
-                                        std::move(productFamily));
+  const int32_t clientType = facts->compType;
+  auto backend = std::make_shared<QDXBackend>(Making(), configuration.platform, std::move(name),
+                                              std::move(profile), std::move(facts));
   log.normal("QDXBackend(initWithName): Loading QDX adaptor class for client type %d", clientType);
   if (!isClientTypeAllowed(clientType)) {
     log.error("QDXBackend(initWithName): No matching bundle found for client type %d", clientType);
@@ -52,7 +42,7 @@ std::shared_ptr<QDXBackend> QDXBackend::initWithName(Configuration& configuratio
 }
 
 void QDXBackend::loadAdaptor() {
-  clientBundle_ = platform_.pluginBundles.bundleWithPath(kBundlePath);
+  clientBundle_ = platform().pluginBundles.bundleWithPath(kBundlePath);
   if (clientBundle_ == nullptr) return;
   if (!clientBundle_->isLoaded()) clientBundle_->load();
   qdxAdaptorClass_ = clientBundle_->classNamed(kAdaptorClass);
@@ -65,10 +55,10 @@ Value QDXBackend::sendMessage(Dictionary message, const TimeValue&, uint16_t met
     qdxAdaptor_->invoke(kForwardingOperation, method, respCode, message);
     return {};
   }
-  platform_.counters.add(Reason::adaptorUnavailable);
+  platform().counters.add(Reason::adaptorUnavailable);
   const std::string adaptor = qdxAdaptor_ != nullptr ? qdxAdaptor_->description() : "(null)";
-  platform_.log.error("QDXBackend(sendMessage): QDX adaptor %s does not respond to forwarding selector %s",
-                      adaptor.c_str(), kForwardingOperation);
+  platform().log.error("QDXBackend(sendMessage): QDX adaptor %s does not respond to forwarding selector %s",
+                       adaptor.c_str(), kForwardingOperation);
   return {};
 }
 

@@ -14,21 +14,15 @@ namespace kyt {
 
 class QDXBackend : public KYTReportingBackend {
  public:
-  // Null, with a line in the log, for a client type that is not allowed.
+  // Null, with a line in the log, for a session of a client type that is not allowed.
   static std::shared_ptr<QDXBackend> initWithName(Configuration& configuration, String name,
-                                                  Dictionary profile, std::optional<String> productFamily,
-                                                  int32_t clientType);
-  // For client type 0, which is not allowed: always null.
-  static std::shared_ptr<QDXBackend> initWithName(Configuration& configuration, String name,
-                                                  Dictionary profile, std::optional<String> productFamily);
+                                                  Dictionary profile, SharedSessionFacts facts);
+  using KYTReportingBackend::KYTReportingBackend;
   [[nodiscard]] static bool isClientTypeAllowed(int32_t clientType);
 
   using KYTReportingBackend::sendMessage;
   Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override;
-
- protected:
-  using KYTReportingBackend::KYTReportingBackend;
 
  private:
   void loadAdaptor();

@@ -108,32 +108,32 @@ std::string_view lastPathComponent(std::string_view path) {
 }
 
 std::shared_ptr<UploadBackend> UploadBackend::initWithName(Configuration& configuration, String name,
-                                                           Dictionary profile,
-                                                           std::optional<String> productFamily) {
-  struct Made final : UploadBackend {
-    Made(Platform& p, String n, Dictionary d, std::optional<String> f)
-        : UploadBackend(p, std::move(n), std::move(d), std::move(f)) {}
-  };
+                                                           Dictionary profile, SharedSessionFacts facts) {
   const Value* url = profile.find("post_url");
   const String* postURL = url != nullptr ? url->string() : nullptr;
   if (postURL == nullptr) {
     configuration.platform.log.error("UploadBackend(initWithName): can't resolve upload post URL.");
     return nullptr;
   }
-  const auto backend = std::make_shared<Made>(configuration.platform, std::move(name), std::move(profile),
-                                              std::move(productFamily));
-  backend->uploadURL_ = *postURL;
-  if (const Value* displayURL = backend->profile_.find("display_url"); displayURL != nullptr)
-    if (const String* text = displayURL->string()) backend->displayURL_ = *text;
-  return backend;
+  String uploadURL = *postURL;
+  return std::make_shared<UploadBackend>(Making(), configuration.platform, std::move(name),
+                                         std::move(profile), std::move(facts), std::move(uploadURL));
+}
+
+UploadBackend::UploadBackend(Making making, Platform& platform, String name, Dictionary profile,
+                             SharedSessionFacts facts, String uploadURL)
+    : KYTReportingBackend(making, platform, std::move(name), std::move(profile), std::move(facts)),
+      uploadURL_(std::move(uploadURL)) {
+  if (const Value* url = this->profile().find("display_url"); url != nullptr)
+    if (const String* text = url->string()) setDisplayURL(*text);
 }
 
 bool UploadBackend::uploadFileAtPath(const String& path, const String& extensionToken,
                                      std::optional<FileExtension>& extension) {
-  Log& log = platform_.log;
+  Log& log = platform().log;
   log.normal("UploadBackend(uploadFileAtPath): Uploading file %s", path.c_str());
   if (!uploadURL_) return false;
-  const std::unique_ptr<FileAccess> file = platform_.fileExtensions.consume(extensionToken, extension);
+  const std::unique_ptr<FileAccess> file = platform().fileExtensions.consume(extensionToken, extension);
   if (file == nullptr || !file->isReadableRegularFile()) {
     log.error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
     return false;
@@ -149,7 +149,7 @@ bool UploadBackend::uploadFileAtPath(const String& path, const String& extension
   const auto poster = connectivityDelegate();
   // Deliberately still true: the client's file was taken, and stays where it is.
   if (poster == nullptr) {
-    platform_.counters.add(Reason::postWithoutPoster);
+    platform().counters.add(Reason::postWithoutPoster);
     return true;
   }
   // A failed removal is no failure of the upload; whoever removes files counts it.
@@ -158,17 +158,17 @@ bool UploadBackend::uploadFileAtPath(const String& path, const String& extension
 }
 
 std::optional<Data> UploadBackend::compressedFile(FileAccess& file) {
-  Log& log = platform_.log;
-  const uint64_t most = platform_.limits.maxUploadBytes;
+  Log& log = platform().log;
+  const uint64_t most = platform().limits.maxUploadBytes;
   std::variant<Data, FileReadError> read = file.readWhole(most);
   const FileReadError* error = std::get_if<FileReadError>(&read);
   if (error != nullptr && *error == FileReadError::tooLarge) {
-    if (platform_.counters.addAndMayLog(Reason::uploadTooLarge, platform_.clock.monotonic()))
+    if (platform().counters.addAndMayLog(Reason::uploadTooLarge, platform().clock.monotonic()))
       log.error("UploadBackend(uploadFileAtPath): Input file is over the limit of %" PRIu64 " bytes", most);
     return std::nullopt;
   }
   if (error != nullptr && *error == FileReadError::tooMuchAtOnce) {
-    if (platform_.counters.addAndMayLog(Reason::tooMuchUploadedAtOnce, platform_.clock.monotonic()))
+    if (platform().counters.addAndMayLog(Reason::tooMuchUploadedAtOnce, platform().clock.monotonic()))
       log.error(
           "UploadBackend(uploadFileAtPath): Input file refused, too much of its user is being uploaded");
     return std::nullopt;
@@ -183,7 +183,7 @@ std::optional<Data> UploadBackend::compressedFile(FileAccess& file) {
   {
     // A large file takes seconds: as long as a wait, and no reason for other sessions to stand in line.
     const BlockingScope blocking;
-    body = gzipDeflate(platform_, contents->bytes());
+    body = gzipDeflate(platform(), contents->bytes());
   }
   file.holdsOnly(body ? body->size() : 0);
   return body;
@@ -195,7 +195,7 @@ std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, D
   const std::string compressedName = std::string(fileName) + ".gz";
   request.url = formatObjects(
       "%@?uuid=%s&sequence=%u&description=%@%%20(Uploaded%%20by%%20TQS)&filename=%@&raw=true",
-      {*uploadURL_, String(udid_ != nullptr ? udid_ : ""), sessionID_,
+      {*uploadURL_, facts().udid.value_or(String()), facts().sessionID,
        String(percentEncodedForQuery(kDescription)), String(percentEncodedForQuery(compressedName))});
   // The whole of it: what "post_url" says may become an address, or stop being one, by what follows it.
   if (!isAddress(request.url)) return std::nullopt;
@@ -217,9 +217,9 @@ bool UploadBackend::post(ReportingSessionConnectivityInterface& poster, URLReque
         answered.signal();
       });
   answered.wait();
-  Log& log = platform_.log;
+  Log& log = platform().log;
   if (!reply) {
-    platform_.counters.add(Reason::postFailed);
+    platform().counters.add(Reason::postFailed);
     log.error("UploadBackend(uploadFileAtPath): post %s",
               failure ? failure->localizedDescription.c_str() : "(null)");
     return false;

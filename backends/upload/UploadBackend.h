@@ -20,7 +20,9 @@ class UploadBackend : public KYTReportingBackend {
  public:
   // Null, with a line in the log, when the profile has no "post_url".
   static std::shared_ptr<UploadBackend> initWithName(Configuration& configuration, String name,
-                                                     Dictionary profile, std::optional<String> productFamily);
+                                                     Dictionary profile, SharedSessionFacts facts);
+  UploadBackend(Making, Platform& platform, String name, Dictionary profile, SharedSessionFacts facts,
+                String uploadURL);
 
   // True once a request was built and handed to the poster, whatever the server then answers.
   [[nodiscard]] bool uploadFileAtPath(const String& path, const String& extensionToken,
@@ -28,9 +30,6 @@ class UploadBackend : public KYTReportingBackend {
 
   [[nodiscard]] const std::optional<String>& uploadURL() const { return uploadURL_; }
   void setUploadURL(std::optional<String> value) { uploadURL_ = std::move(value); }
-
- protected:
-  using KYTReportingBackend::KYTReportingBackend;
 
  private:
   [[nodiscard]] std::optional<Data> compressedFile(FileAccess& file);

@@ -21,11 +21,10 @@ class BackendFactoryTest : public testing::Test {
   };
 
   BackendCreator creator(const char* name, const char* label) {
-    return {name, [this, label](const String& n, const Dictionary& profile,
-                                const std::optional<String>& family, int32_t clientType) {
-              made_.push_back({label, family, clientType});
+    return {name, [this, label](const String& n, const Dictionary& profile, const SharedSessionFacts& facts) {
+              made_.push_back({label, facts->productFamily, facts->compType});
               platform_.clock.setTimeOfDay({200, 0});  // making one takes its time
-              return KYTReportingBackend::initWithName(platform_.platform, n, profile, family);
+              return KYTReportingBackend::initWithName(platform_.platform, n, profile, facts);
             }};
   }
   DefaultBackendFactory factory() {
@@ -95,7 +94,8 @@ TEST_F(BackendFactoryTest, AnUnknownNameIsLoggedAndTheOthersAreMade) {
 
 TEST_F(BackendFactoryTest, ANameWhoseClassIsNotThereIsUnknown) {
   DefaultBackendFactory none(platform_.configuration, {});
-  EXPECT_EQ(none.newBackendWithName(kKYTReportingBackendHTTPPost, {}, std::nullopt, 7), nullptr);
+  EXPECT_EQ(none.newBackendWithName(kKYTReportingBackendHTTPPost, {}, std::make_shared<SessionFacts>()),
+            nullptr);
   EXPECT_TRUE(platform_.sink.contains(LogLevel::error, "KYTReportingBackend(newBackendWithName): httppost"));
 }
 
@@ -146,22 +146,20 @@ TEST_F(BackendFactoryTest, StampsSessionDeviceAndVersionOnEveryBackEnd) {
   ASSERT_EQ(backends->size(), 2u);
   for (const auto& [name, backend] : *backends) {
     EXPECT_EQ(backend->name(), name);
-    EXPECT_EQ(backend->sessionID(), 4294967295u);
-    EXPECT_EQ(backend->compType(), 11);
-    EXPECT_EQ(backend->clientVersion(), 1);
-    EXPECT_STREQ(backend->udid(), "device");
-    EXPECT_EQ(backend->productVersion(), String("17.1"));
-    EXPECT_EQ(backend->buildVersion(), String("21B74"));
-    EXPECT_EQ(backend->hardwareType(), String("Phone9,1"));
-    EXPECT_EQ(backend->productFamily(), String("Phone"));
-    EXPECT_TRUE(backend->isInternal());
-    EXPECT_TRUE(backend->requireUserInfo());
+    EXPECT_EQ(backend->facts().sessionID, 4294967295u);
+    EXPECT_EQ(backend->facts().compType, 11);
+    EXPECT_EQ(backend->facts().clientVersion, 1);
+    EXPECT_EQ(backend->facts().udid, String("device"));
+    EXPECT_EQ(backend->facts().productVersion, String("17.1"));
+    EXPECT_EQ(backend->facts().buildVersion, String("21B74"));
+    EXPECT_EQ(backend->facts().hardwareType, String("Phone9,1"));
+    EXPECT_EQ(backend->facts().productFamily, String("Phone"));
+    EXPECT_TRUE(backend->facts().isInternal);
+    EXPECT_TRUE(backend->facts().requireUserInfo);
     EXPECT_TRUE(backend->batchEvents());
     EXPECT_EQ(backend->userInfoDict(), userInfo);
-    EXPECT_EQ(backend->selfVersionMajor(), 9);
-    EXPECT_EQ(backend->selfVersionMiddle(), 1);
-    EXPECT_EQ(backend->selfVersionMinor(), 2);
-    EXPECT_EQ(backend->startTimeStamp(), 100.5);
+    EXPECT_EQ(backend->facts().selfVersion, (std::array<uint8_t, 3>{9, 1, 2}));
+    EXPECT_EQ(backend->facts().startTimeStamp, 100.5);
     EXPECT_EQ(backend->state(), kBackendStateUndecided);
     EXPECT_EQ(backend.use_count(), 1);
   }
@@ -170,10 +168,10 @@ TEST_F(BackendFactoryTest, StampsSessionDeviceAndVersionOnEveryBackEnd) {
 TEST_F(BackendFactoryTest, WhatTheSessionInformationLacksReadsAsZero) {
   const auto backends = create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}}, Dictionary{});
   const KYTReportingBackend& backend = *backends->find(kKYTReportingBackendDashboard);
-  EXPECT_EQ(backend.sessionID(), 0u);
-  EXPECT_EQ(backend.compType(), 0);
-  EXPECT_EQ(backend.clientVersion(), 0);
-  EXPECT_FALSE(backend.requireUserInfo());
+  EXPECT_EQ(backend.facts().sessionID, 0u);
+  EXPECT_EQ(backend.facts().compType, 0);
+  EXPECT_EQ(backend.facts().clientVersion, 0);
+  EXPECT_FALSE(backend.facts().requireUserInfo);
   EXPECT_FALSE(backend.batchEvents());
   EXPECT_FALSE(backend.userInfoDict());
 }
@@ -182,9 +180,7 @@ TEST_F(BackendFactoryTest, ADaemonWithoutAVersionIs8) {
   platform_.daemonBundle.setVersion(std::nullopt);
   const auto backends = create(Dictionary{{kKYTReportingBackendDashboard, Dictionary{}}}, Dictionary{});
   const KYTReportingBackend& backend = *backends->find(kKYTReportingBackendDashboard);
-  EXPECT_EQ(backend.selfVersionMajor(), 8);
-  EXPECT_EQ(backend.selfVersionMiddle(), 0);
-  EXPECT_EQ(backend.selfVersionMinor(), 0);
+  EXPECT_EQ(backend.facts().selfVersion, (std::array<uint8_t, 3>{8, 0, 0}));
 }
 
 TEST_F(BackendFactoryTest, KeepsTheOrderOfTheTable) {

@@ -15,16 +15,17 @@ namespace {
 // A back end that remembers what reached its sending operation, and lets tests set the lists.
 class RecordingBackend : public KYTReportingBackend {
  public:
-  explicit RecordingBackend(Platform& platform) : KYTReportingBackend(platform, "name", {}, "Phone") {}
+  explicit RecordingBackend(Platform& platform)
+      : KYTReportingBackend(Making(), platform, "name", {}, std::make_shared<SessionFacts>()) {}
   using KYTReportingBackend::sendMessage;
+  using KYTReportingBackend::setEventBlacklist;
+  using KYTReportingBackend::setEventWhitelist;
   Value sendMessage(Dictionary, const TimeValue&, uint16_t method, uint16_t, EventID eventID,
                     MessageFlag flag) override {
     lastEventID = static_cast<uint16_t>(eventID);
     lastFlag = flag;
     return Value(method);
   }
-  void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }
-  void setEventBlacklist(std::optional<Array> list) { eventBlacklist_ = std::move(list); }
   std::shared_ptr<ReportingSessionConnectivityInterface> delegate() const { return connectivityDelegate(); }
   String identifier(bool respectDnu) { return getPersistentIdentifierForDNU(respectDnu); }
 
@@ -83,16 +84,16 @@ TEST_F(KYTReportingBackendTest, ABlacklistRefusesWhatItHoldsAndNoOther) {
   EXPECT_FALSE(backend().isBlacklistedEvent(6));
 }
 
-TEST_F(KYTReportingBackendTest, ParsesTheSelfVersion) {
-  const auto parsed = [this](const char* text) {
-    backend().setSelfVersion(text);
-    return std::vector<int>{backend().selfVersionMajor(), backend().selfVersionMiddle(),
-                            backend().selfVersionMinor()};
+TEST(SessionFactsTest, ParseTheSelfVersion) {
+  const auto parsed = [](const char* text) {
+    SessionFacts facts;
+    facts.setSelfVersion(text);
+    return facts.selfVersion;
   };
-  EXPECT_EQ(parsed("8.0"), (std::vector<int>{8, 0, 0}));
-  EXPECT_EQ(parsed("10.2.3.4"), (std::vector<int>{10, 2, 3}));
-  EXPECT_EQ(parsed("300"), (std::vector<int>{44, 0, 0}));
-  EXPECT_EQ(parsed("abc"), (std::vector<int>{0, 0, 0}));
+  EXPECT_EQ(parsed("8.0"), (std::array<uint8_t, 3>{8, 0, 0}));
+  EXPECT_EQ(parsed("10.2.3.4"), (std::array<uint8_t, 3>{10, 2, 3}));
+  EXPECT_EQ(parsed("300"), (std::array<uint8_t, 3>{44, 0, 0}));
+  EXPECT_EQ(parsed("abc"), (std::array<uint8_t, 3>{0, 0, 0}));
 }
 
 TEST_F(KYTReportingBackendTest, HashesTextAsTheStandardSays) {
@@ -139,9 +140,10 @@ TEST_F(KYTReportingBackendTest, AnswersAFlushAtOnceWithNothing) {
   EXPECT_TRUE(backend().flushMessagesWithCompletion(nullptr).isNull());
 }
 
-TEST_F(KYTReportingBackendTest, StoresTheStartTimeAsSeconds) {
-  backend().setStartTimestamp({1, 500000});
-  EXPECT_EQ(backend().startTimeStamp(), 1.5);
+TEST(SessionFactsTest, StoreTheStartTimeAsSeconds) {
+  SessionFacts facts;
+  facts.setStartTimestamp({1, 500000});
+  EXPECT_EQ(facts.startTimeStamp, 1.5);
 }
 
 TEST_F(KYTReportingBackendTest, ReadsTheStateThatWasWrittenBefore) {
@@ -167,25 +169,27 @@ TEST_F(KYTReportingBackendTest, CanBeDestroyedWhileItsStateIsBeingWritten) {
 }
 
 TEST_F(KYTReportingBackendTest, DrawsOneOf101SamplingFactors) {
-  platform_.random.setDraw(0);
-  EXPECT_EQ(KYTReportingBackend::initWithName(platform_.platform, "a", {}, std::nullopt)->samplingFactor(),
-            0.0);
-  platform_.random.setDraw(31);
-  EXPECT_EQ(KYTReportingBackend::initWithName(platform_.platform, "a", {}, std::nullopt)->samplingFactor(),
-            0.31);
-  platform_.random.setDraw(100);
-  EXPECT_EQ(KYTReportingBackend::initWithName(platform_.platform, "a", {}, std::nullopt)->samplingFactor(),
-            1.0);
+  const auto drawn = [this](uint32_t draw) {
+    platform_.random.setDraw(draw);
+    return KYTReportingBackend::initWithName(platform_.platform, "a", {}, std::make_shared<SessionFacts>())
+        ->samplingFactor();
+  };
+  EXPECT_EQ(drawn(0), 0.0);
+  EXPECT_EQ(drawn(31), 0.31);
+  EXPECT_EQ(drawn(100), 1.0);
   const std::vector<uint32_t> bounds = platform_.random.bounds();
   ASSERT_GE(bounds.size(), 3u);
   for (const uint32_t bound : bounds) EXPECT_EQ(bound, 101u);
 }
 
 TEST_F(KYTReportingBackendTest, TheBaseAloneDoesNothing) {
-  const auto plain = KYTReportingBackend::initWithName(platform_.platform, "a", {{"k", 1}}, String("Phone"));
+  SessionFacts facts;
+  facts.productFamily = String("Phone");
+  const auto plain = KYTReportingBackend::initWithName(platform_.platform, "a", {{"k", 1}},
+                                                       std::make_shared<SessionFacts>(facts));
   EXPECT_EQ(plain->name(), "a");
   EXPECT_EQ(plain->profile().size(), 1u);
-  EXPECT_EQ(plain->productFamily(), String("Phone"));
+  EXPECT_EQ(plain->facts().productFamily, String("Phone"));
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, MessageFlag{}).isNull());
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}).isNull());
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}, MessageFlag{}).isNull());

@@ -59,7 +59,10 @@ TEST(BackendTable, EachOtherNameStandsForItsOwnClass) {
   TestPlatform platform;
   DefaultBackendFactory factory(platform.configuration, backendTable(platform.configuration));
   const auto make = [&](const char* name) {
-    return factory.newBackendWithName(name, Dictionary{{"post_url", "https://u"}}, std::nullopt, 7);
+    SessionFacts facts;
+    facts.compType = 7;
+    return factory.newBackendWithName(name, Dictionary{{"post_url", "https://u"}},
+                                      std::make_shared<SessionFacts>(facts));
   };
   EXPECT_NE(dynamic_cast<UploadBackend*>(make(kKYTReportingBackendUploadServer).get()), nullptr);
   EXPECT_NE(dynamic_cast<AmpyxBackend*>(make(kKYTReportingBackendAmpyx).get()), nullptr);

@@ -28,7 +28,8 @@ class RecordingBackend final : public KYTReportingBackend {
   };
 
   RecordingBackend(Platform& platform, String name, Dictionary profile)
-      : KYTReportingBackend(platform, std::move(name), std::move(profile), std::nullopt) {}
+      : KYTReportingBackend(Making(), platform, std::move(name), std::move(profile),
+                            std::make_shared<SessionFacts>()) {}
 
   // How it answers.
   Value answer;  // of a send
@@ -39,8 +40,8 @@ class RecordingBackend final : public KYTReportingBackend {
   Value flushResult;
   std::optional<Error> flushError;
   void setLists(std::optional<Array> whitelist, std::optional<Array> blacklist) {
-    eventWhitelist_ = std::move(whitelist);
-    eventBlacklist_ = std::move(blacklist);
+    setEventWhitelist(std::move(whitelist));
+    setEventBlacklist(std::move(blacklist));
   }
 
   // What it was given.
@@ -135,7 +136,7 @@ class RecordingBackendFactory final : public BackendFactory {
   }
 
   std::shared_ptr<KYTReportingBackend> newBackendWithName(const String& name, const Dictionary& profile,
-                                                          std::optional<String>, int32_t) override {
+                                                          const SharedSessionFacts&) override {
     if (unknownNames.count(name.str()) != 0) return nullptr;
     auto backend = std::make_shared<RecordingBackend>(platform_, name, profile);
     if (prepare) prepare(*backend);
@@ -146,17 +147,16 @@ class RecordingBackendFactory final : public BackendFactory {
   std::optional<Backends> createBackends(const std::optional<Dictionary>& table,
                                          const std::optional<Dictionary>& sessionInfo,
                                          const std::optional<Dictionary>& userInfo,
-                                         const char* udid) override {
+                                         const String& udid) override {
     {
       MutexLock lock(mutex_);
-      calls_.push_back({table, sessionInfo, userInfo, udid});
+      calls_.push_back({table, sessionInfo, userInfo, udid.str()});
     }
     if (!table || !sessionInfo) return std::nullopt;
     Backends backends;
     for (const DictionaryEntry& entry : *table) {
       const Dictionary* profile = entry.value.dictionary();
-      auto backend =
-          newBackendWithName(entry.key, profile != nullptr ? *profile : Dictionary(), std::nullopt, 0);
+      auto backend = newBackendWithName(entry.key, profile != nullptr ? *profile : Dictionary(), nullptr);
       if (backend != nullptr) backends.add(entry.key, std::move(backend));
     }
     return backends;

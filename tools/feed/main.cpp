@@ -66,24 +66,19 @@ void pauseFor(Duration duration) {
 }
 
 std::shared_ptr<DashboardBackend> makeBackend(Machine& machine, const Options& options) {
-  std::shared_ptr<DashboardBackend> backend;
-  if (options.withoutProfile) {
-    backend =
-        DashboardBackend::initWithName(machine.platform, kKYTReportingBackendDashboard,
-                                       std::optional<String>(options.server), options.port, std::nullopt);
-  } else {
-    Dictionary profile{{"ip", options.server}, {"port", int64_t{options.port}}};
-    if (options.reliable) profile.set("reliable", *options.reliable);
-    backend = DashboardBackend::initWithName(machine.platform, kKYTReportingBackendDashboard,
-                                             std::optional<Dictionary>(profile), std::nullopt);
-  }
-  if (!backend) return nullptr;
-  backend->setSessionID(options.session);
-  backend->setCompType(options.clientType);
-  backend->setClientVersion(options.clientVersion);
-  backend->setSelfVersion(options.selfVersion);
-  backend->setUdid(options.device.c_str());
-  return backend;
+  const auto facts = std::make_shared<SessionFacts>();
+  facts->sessionID = options.session;
+  facts->compType = options.clientType;
+  facts->clientVersion = options.clientVersion;
+  facts->udid = String(options.device);
+  facts->setSelfVersion(options.selfVersion);
+  if (options.withoutProfile)
+    return DashboardBackend::initWithName(machine.platform, kKYTReportingBackendDashboard,
+                                          std::optional<String>(options.server), options.port, facts);
+  Dictionary profile{{"ip", options.server}, {"port", int64_t{options.port}}};
+  if (options.reliable) profile.set("reliable", *options.reliable);
+  return DashboardBackend::initWithName(machine.platform, kKYTReportingBackendDashboard,
+                                        std::optional<Dictionary>(profile), facts);
 }
 
 class Feed {

@@ -18,7 +18,7 @@ class Ampyx : public testing::Test {
 
   TestPlatform platform_;
   std::shared_ptr<AmpyxBackend> backend_ = AmpyxBackend::initWithName(
-      platform_.configuration, kKYTReportingBackendAmpyx, Dictionary{}, std::nullopt);
+      platform_.configuration, kKYTReportingBackendAmpyx, Dictionary{}, std::make_shared<SessionFacts>());
 };
 
 TEST_F(Ampyx, RecordsTheMessageWithItsNumbers) {

@@ -13,7 +13,7 @@ namespace {
 TEST(PowerLogWireExample, IsWhatIsRecorded) {
   TestPlatform platform;
   const auto backend = AmpyxBackend::initWithName(platform.configuration, kKYTReportingBackendAmpyx,
-                                                  Dictionary{}, std::nullopt);
+                                                  Dictionary{}, std::make_shared<SessionFacts>());
   const auto message = platform.json.parse(documentBlock("WIRE-POWERLOG.md", "json message"));
   ASSERT_TRUE(std::holds_alternative<Value>(message));
   backend->sendMessage(*std::get<Value>(message).dictionary(), TimeValue{1769860800, 0}, 2, 3, EventID{4});

@@ -46,9 +46,8 @@ class RecordingDashboard final : public DashboardBackend {
         platform.platform, profile, std::get<std::unique_ptr<UDPSocket>>(platform.udpSockets.open()));
   }
   RecordingDashboard(Platform& platform, const Dictionary& profile, std::unique_ptr<UDPSocket> socket)
-      : DashboardBackend(platform, "dashboard", profile, std::nullopt, std::move(socket)) {
-    postURL_ = "https://logs.example.org";
-  }
+      : DashboardBackend(Making(), platform, "dashboard", profile, std::make_shared<SessionFacts>(),
+                         std::move(socket)) {}
   using DashboardBackend::sendMessage;
   Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override {
@@ -62,7 +61,8 @@ class RecordingDashboard final : public DashboardBackend {
 };
 
 TEST_F(LogData, ReportsItsLocationAsAnEvent) {
-  const auto recording = RecordingDashboard::make(platform_, profile());
+  const auto recording =
+      RecordingDashboard::make(platform_, profile({{"post_url", "https://logs.example.org"}}));
   recording->setReportingSessionConnectivityDelegate(poster_);
   platform_.clock.setTimeOfDay({1769860801, 250000});
   EXPECT_TRUE(recording->uploadLogData(entries_));
@@ -154,7 +154,8 @@ TEST_F(LogData, TakesAnyBodyForTheLocation) {
 }
 
 TEST_F(LogData, TakesABodyThatIsNoTextForNoLocation) {
-  const auto recording = RecordingDashboard::make(platform_, profile());
+  const auto recording =
+      RecordingDashboard::make(platform_, profile({{"post_url", "https://logs.example.org"}}));
   recording->setReportingSessionConnectivityDelegate(poster_);
   poster_->data = Data(std::string_view("https://logs\xff"));
   EXPECT_TRUE(recording->uploadLogData(entries_));

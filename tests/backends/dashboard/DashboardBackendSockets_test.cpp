@@ -36,7 +36,8 @@ class DashboardSockets : public ::testing::Test {
     return out;
   }
   std::shared_ptr<DashboardBackend> make(const std::optional<Dictionary>& profile) {
-    return DashboardBackend::initWithName(platform_, kKYTReportingBackendDashboard, profile, std::nullopt);
+    return DashboardBackend::initWithName(platform_, kKYTReportingBackendDashboard, profile,
+                                          std::make_shared<SessionFacts>());
   }
   void send(uint16_t number) { backend_->sendMessage({{"k", "v"}}, {5, 0}, 2, 3, EventID{number}); }
   static std::string acknowledgement(uint16_t number, size_t length = 64) {
@@ -99,7 +100,8 @@ TEST_F(DashboardSockets, EveryFailureToMakeOneLeavesNoDescriptor) {
     EXPECT_EQ(make(unparsable), nullptr);
   }
   EXPECT_EQ(DashboardBackend::initWithName(platform_, kKYTReportingBackendDashboard,
-                                           std::optional<String>("no address"), 1, std::nullopt),
+                                           std::optional<String>("no address"), 1,
+                                           std::make_shared<SessionFacts>()),
             nullptr);
   EXPECT_EQ(fakes_.sink.count(LogLevel::error, "DashboardBackend(initWithName): socket connect() failed."),
             3u);

@@ -47,7 +47,7 @@ TEST_F(Dashboard, ConnectsToTheServerOfItsProfile) {
       make(profile({{"display_url", "https://show.example.org"}, {"post_url", "https://logs.example.org"}})),
       nullptr);
   EXPECT_EQ(backend_->name(), "dashboard");
-  EXPECT_EQ(backend_->productFamily(), String("Phone"));
+  EXPECT_EQ(backend_->facts().productFamily, String("Phone"));
   EXPECT_EQ(backend_->profile(),
             profile({{"display_url", "https://show.example.org"}, {"post_url", "https://logs.example.org"}}));
   EXPECT_EQ(backend_->displayURL(), String("https://show.example.org"));
@@ -229,11 +229,11 @@ TEST_F(Dashboard, CannotConnectToWhatIsNoAddress) {
 }
 
 TEST_F(Dashboard, EveryFieldOfTheHeaderIsInItsPlace) {
+  facts_.setSelfVersion("9.1.2");
+  facts_.compType = 0x114;  // its low byte counts
+  facts_.sessionID = 0x01020304;
+  facts_.clientVersion = 0x0506;
   ASSERT_NE(make(reliable()), nullptr);
-  backend_->setSelfVersion("9.1.2");
-  backend_->setCompType(0x114);  // its low byte counts
-  backend_->setSessionID(0x01020304);
-  backend_->setClientVersion(0x0506);
   send(0xABCD, {{"k", "v"}}, {0x1122334455, 999999}, 0x0708, 0x090A);
   const std::string device(kTestDevice);
   EXPECT_EQ(socket().sent.at(0), bytes({9, 0x14, 1, 249, 0x22, 0x33, 0x44, 0x55}) +  // versions, time
@@ -259,19 +259,18 @@ TEST_F(Dashboard, ATimeIsCarriedInUnitsOf4Milliseconds) {
 }
 
 TEST_F(Dashboard, ADeviceIdentifierIsCutAt40AndFilledUpWithZeros) {
-  ASSERT_NE(make(profile()), nullptr);
-  const std::string longer = std::string(kTestDevice) + "tail";
-  backend_->setUdid(longer.c_str());
-  send(1);
+  const auto of = [this](std::optional<String> udid) {
+    facts_.udid = std::move(udid);
+    make(profile());
+    return send(1);
+  };
+  of(String(std::string(kTestDevice) + "tail"));
   EXPECT_EQ(socket().sent.back().substr(20, 40), kTestDevice);
   EXPECT_EQ(socket().sent.back().substr(60, 2), bytes({0, 1}));
-  backend_->setUdid("short");
-  EXPECT_NE(send(1).find(" short 127.0.0.1 "), std::string::npos);
+  EXPECT_NE(of(String("short")).find(" short 127.0.0.1 "), std::string::npos);
   EXPECT_EQ(socket().sent.back().substr(20, 40), "short" + std::string(35, '\0'));
-  backend_->setUdid("");
-  EXPECT_NE(send(1).find("5.120  127.0.0.1 "), std::string::npos);
-  backend_->setUdid(nullptr);
-  EXPECT_NE(send(1).find("5.120  127.0.0.1 "), std::string::npos);
+  EXPECT_NE(of(String("")).find("5.120  127.0.0.1 "), std::string::npos);
+  EXPECT_NE(of(std::nullopt).find("5.120  127.0.0.1 "), std::string::npos);
 }
 
 TEST_F(Dashboard, PutsShorterValuesFirst) {
@@ -362,26 +361,27 @@ TEST_F(Dashboard, TheLocalLogLineShowsEveryFieldPlain) {
   EXPECT_EQ(send(4, {{"k1", "abc"}, {"k2", 12345}}, {1769860800, 987654}, 2, 3),
             std::string("1769860800.984 ") + kTestDevice +
                 " 127.0.0.1 QG     3     1     4     2     3  k1=abc k2=12345");
-  backend_->setSessionID(4294967295U);
-  backend_->setClientVersion(65535);
-  backend_->setCompType(23);
+  facts_.sessionID = 4294967295U;
+  facts_.clientVersion = 65535;
+  facts_.compType = 23;
+  ASSERT_NE(make(profile()), nullptr);
   EXPECT_EQ(send(65535, {}, {-1, 0}, 65535, 65535), std::string("4294967295.000 ") + kTestDevice +
                                                         " 127.0.0.1 QV 65535 4294967295 65535 65535 65535 ");
 }
 
 TEST_F(Dashboard, AClientTypeOutsideTheTableHasAName) {
-  ASSERT_NE(make(profile()), nullptr);
-  backend_->setCompType(24);
-  EXPECT_NE(send(1).find(" 127.0.0.1 Unknown "), std::string::npos);
-  backend_->setCompType(-1);
-  EXPECT_NE(send(1).find(" 127.0.0.1 Unknown "), std::string::npos);
+  for (const int32_t type : {24, -1}) {
+    facts_.compType = type;
+    ASSERT_NE(make(profile()), nullptr);
+    EXPECT_NE(send(1).find(" 127.0.0.1 Unknown "), std::string::npos);
+  }
 }
 
 TEST_F(Dashboard, TheLongestLineIsWhole) {
+  facts_.sessionID = 4294967295U;
+  facts_.clientVersion = 65535;
+  facts_.compType = 99;
   ASSERT_NE(make(profile()), nullptr);
-  backend_->setSessionID(4294967295U);
-  backend_->setClientVersion(65535);
-  backend_->setCompType(99);
   const std::string line = send(65535, {{"k", std::string(2000, 'x')}}, {4294967295, 999999}, 65535, 65535);
   EXPECT_TRUE(line.ends_with(" k=" + std::string(1020, 'x')));
 }

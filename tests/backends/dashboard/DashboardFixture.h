@@ -39,6 +39,14 @@ class AnsweringPoster final : public ReportingSessionConnectivityInterface {
 
 class DashboardFixture : public ::testing::Test {
  protected:
+  DashboardFixture() {
+    facts_.sessionID = 1;
+    facts_.compType = 6;
+    facts_.clientVersion = 3;
+    facts_.setSelfVersion("8.0");
+    facts_.udid = String(kTestDevice);
+    facts_.productFamily = String("Phone");
+  }
   ~DashboardFixture() override {
     backend_.reset();
     platform_.executor.runAll();
@@ -53,24 +61,13 @@ class DashboardFixture : public ::testing::Test {
   static Dictionary reliable() { return profile({{"reliable", 500}}); }
   DashboardBackend* make(const std::optional<Dictionary>& profile) {
     backend_ = DashboardBackend::initWithName(platform_.platform, kKYTReportingBackendDashboard, profile,
-                                              String("Phone"));
-    setUp();
+                                              std::make_shared<SessionFacts>(facts_));
     return backend_.get();
   }
   DashboardBackend* makeWithoutProfile(const std::optional<String>& ip, uint16_t port) {
     backend_ = DashboardBackend::initWithName(platform_.platform, kKYTReportingBackendDashboard, ip, port,
-                                              String("Phone"));
-    setUp();
+                                              std::make_shared<SessionFacts>(facts_));
     return backend_.get();
-  }
-  // What the factory sets.
-  void setUp() const {
-    if (!backend_) return;
-    backend_->setSessionID(1);
-    backend_->setCompType(6);
-    backend_->setClientVersion(3);
-    backend_->setSelfVersion("8.0");
-    backend_->setUdid(kTestDevice);
   }
 
   // Sends and runs the network queue; the local log line.
@@ -116,6 +113,7 @@ class DashboardFixture : public ::testing::Test {
   }
 
   TestPlatform platform_;
+  SessionFacts facts_;
   std::shared_ptr<DashboardBackend> backend_;
 };
 

@@ -41,9 +41,9 @@ TEST_F(DashboardWireExample, TheDatagramIsWhatIsSent) {
   const std::string device = block(file, "text device");
   const auto message = platform_.json.parse(block(file, "json message"));
   ASSERT_TRUE(std::holds_alternative<Value>(message));
+  facts_.sessionID = 77;
+  facts_.udid = String(device);
   ASSERT_NE(make(reliable()), nullptr);
-  backend_->setSessionID(77);
-  backend_->setUdid(device.c_str());
   EXPECT_EQ(send(4, *std::get<Value>(message).dictionary(), {1769860800, 987654}), block(file, "text line"));
   EXPECT_EQ(hex(socket().sent.at(0)), block(file, "hex datagram"));
 }

@@ -65,9 +65,21 @@ class HTTPSFixture : public testing::Test {
   HTTPSFixture() {
     platform_.consent.setAllowed(true);
     platform_.deviceProperties.setCountryCode("US");
+    facts_.sessionID = 77;
+    facts_.compType = 6;
+    facts_.clientVersion = 3;
+    facts_.requireUserInfo = true;
+    facts_.batchEvents = true;
+    facts_.udid = String("0123456789012345678901234567890123456789");
+    facts_.productVersion = String("17.1");
+    facts_.buildVersion = String("21B74");
+    facts_.hardwareType = String("Phone9,1");
+    facts_.productFamily = String("Phone");
+    facts_.setSelfVersion("8.0");
+    facts_.setStartTimestamp({1000000020, 0});
   }
 
-  // A back end of the profile {"clients": [entry_]}, its session set up, its state not yet decided.
+  // A back end of the profile {"clients": [entry_]} and the facts_, its state not yet decided.
   HTTPSPostBackend& backend() {
     if (backend_) return *backend_;
     return make(Array{entry_});
@@ -76,19 +88,8 @@ class HTTPSFixture : public testing::Test {
     Dictionary profile{{"clients", std::move(clients)}};
     profile.merge(profileExtras_);
     backend_ = HTTPSPostBackend::initWithName(platform_.configuration, String(kKYTReportingBackendHTTPPost),
-                                              profile, String("Phone"));
-    backend_->setSessionID(77);
-    backend_->setCompType(6);
-    backend_->setClientVersion(3);
-    backend_->setUdid("0123456789012345678901234567890123456789");
-    backend_->setProductVersion(String("17.1"));
-    backend_->setBuildVersion(String("21B74"));
-    backend_->setHardwareType(String("Phone9,1"));
-    backend_->setRequireUserInfo(true);
-    backend_->setBatchEvents(true);
+                                              profile, std::make_shared<SessionFacts>(facts_));
     backend_->setUserInfoDict(userInfo_);
-    backend_->setSelfVersion("8.0");
-    backend_->setStartTimestamp({1000000020, 0});
     backend_->setReportingSessionConnectivityDelegate(poster_);
     return *backend_;
   }
@@ -124,6 +125,7 @@ class HTTPSFixture : public testing::Test {
 
   TestPlatform platform_;
   std::shared_ptr<RecordingPoster> poster_ = std::make_shared<RecordingPoster>();
+  SessionFacts facts_;
   Dictionary profileExtras_;
   std::optional<Dictionary> userInfo_ =
       Dictionary{{kKYTReportingUserInfoClientName, "a"}, {kKYTReportingUserInfoServiceName, "b"}};

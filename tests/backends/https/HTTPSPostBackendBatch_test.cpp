@@ -87,7 +87,7 @@ TEST_F(HTTPSPostBackendBatch, WithoutUserInformationARequiringSessionBatchesEven
 
 TEST_F(HTTPSPostBackendBatch, ASessionThatNeedsNoUserInformationSendsAndFlushesWithoutIt) {
   userInfo_ = std::nullopt;
-  backend().setRequireUserInfo(false);
+  facts_.requireUserInfo = false;
   inState(kBackendStateEnabled);
   send(5);
   EXPECT_EQ(postedRecords(), 1u);
@@ -420,8 +420,8 @@ TEST_F(HTTPSPostBackendBatch, ANewSessionIDIsWrittenIntoTheBatch) {
 
 // New records of such a client have their session's number; those in the batch get the text all the same.
 TEST_F(HTTPSPostBackendBatch, ANewSessionIDReplacesTheNumberOfAClientThatSendsNumbers) {
+  facts_.compType = 7;
   inState(kBackendStateEnabled);
-  backend().setCompType(7);
   send(5);
   backend().setCorrelatedSessionID("12.77");
   send(6);

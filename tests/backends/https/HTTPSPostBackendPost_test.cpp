@@ -61,7 +61,9 @@ TEST_F(HTTPSPostBackendPost, TheClientIDFollowsTheEntry) {
   sending();
   send(5);
   EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuid:a:b"));
-  backend().setIsInternal(true);
+  facts_.isInternal = true;
+  backend_.reset();
+  sending();
   send(5);
   EXPECT_EQ(clientID(), Value("0123456789012345678901234567890123456789"));
 }
@@ -77,27 +79,26 @@ TEST_F(HTTPSPostBackendPost, WithoutConsentTheClientIDIsTheOneOfEntriesThatOverr
 }
 
 TEST_F(HTTPSPostBackendPost, AnyValueButZeroOfExtrasOnInternalSendsTheDevicesIdentifier) {
+  facts_.isInternal = true;
   for (const Value& value : {Value(2), Value(-1), Value(256), Value("3")}) {
     entry_.set("extras_on_internal", value);
     backend_.reset();
     sending();
-    backend().setIsInternal(true);
     send(5);
     EXPECT_EQ(clientID(), Value("0123456789012345678901234567890123456789")) << description(value);
   }
   entry_.set("extras_on_internal", 0);
   backend_.reset();
   sending();
-  backend().setIsInternal(true);
   send(5);
   EXPECT_EQ(clientID(), platform_.userDefaults.value(kKYTReportingDefaultsDomain, "uuidRespectDnu"));
 }
 
 TEST_F(HTTPSPostBackendPost, WithoutAClientIDCarriesItsTimeAlone) {
   entry_.set("extras_on_internal", 1);
+  facts_.isInternal = true;
+  facts_.udid = std::nullopt;
   sending();
-  backend().setIsInternal(true);
-  backend().setUdid(nullptr);
   send(5);
   EXPECT_EQ(message(0).dictionary()->size(), 1u);
   EXPECT_TRUE(message(0).dictionary()->contains("postTime"));
@@ -162,7 +163,7 @@ TEST_F(HTTPSPostBackendPost, ShowsAPrettyTextOnlyWithConsentOrWhereForced) {
 TEST_F(HTTPSPostBackendPost, WithoutConsentAndOverrideShowsNothing) {
   platform_.consent.setAllowed(false);
   entry_.set("expedite", 1);
-  backend().setRequireUserInfo(false);  // the state of such a session asks for no consent
+  facts_.requireUserInfo = false;  // the state of such a session asks for no consent
   decided();
   EXPECT_TRUE(send(5).isNull());
   EXPECT_EQ(poster_->requests.size(), 1u);
@@ -176,9 +177,9 @@ TEST_F(HTTPSPostBackendPost, NobodyWhoAskedForNoPrettyTextPaysForOne) {
 }
 
 TEST_F(HTTPSPostBackendPost, SendsItsHeadersInOrder) {
+  facts_.isInternal = true;
+  facts_.setSelfVersion("8.1.2");
   sending();
-  backend().setIsInternal(true);
-  backend().setSelfVersion("8.1.2");
   backend().setDigestKey(Data(std::string_view("key")));
   send(5);
   std::vector<std::string> names;
@@ -204,9 +205,9 @@ TEST_F(HTTPSPostBackendPost, SendsItsHeadersInOrder) {
 }
 
 TEST_F(HTTPSPostBackendPost, LeavesOutHeadersThatDoNotApply) {
+  facts_.hardwareType = std::nullopt;
   decided();
   backend().setUserInfoDict(std::nullopt);
-  backend().setHardwareType(std::nullopt);
   post("{}");
   for (const char* name : {"X-KYT-Client-Name", "X-KYT-Service-Name", "X-KYT-Internal-Build",
                            "X-KYT-Event-Map", "Content-Encoding", "X-KYT-DIGEST"})
@@ -216,8 +217,8 @@ TEST_F(HTTPSPostBackendPost, LeavesOutHeadersThatDoNotApply) {
 }
 
 TEST_F(HTTPSPostBackendPost, ClientVersionsHaveSixteenBits) {
+  facts_.clientVersion = 65535;
   sending();
-  backend().setClientVersion(65535);
   send(5);
   EXPECT_EQ(poster_->header(0, "X-KYT-Client-Version"), "65535");
   EXPECT_EQ(*events(0).at(0).find("_clientVersion"), Value(65535));
@@ -438,7 +439,6 @@ TEST_F(HTTPSPostBackendPost, ACompletionMayUseTheStateQueueAgain) {
   decided();
   send(5);
   int32_t seen = -1;
-  backend().setRequireUserInfo(true);
   backend().setUserInfoDict(std::nullopt);
   backend().flushMessagesWithCompletion(
       [&](const Value&, const std::optional<Error>&) { seen = backend().state(); });
@@ -498,8 +498,8 @@ TEST_F(LostPosts, CountWithTheirEventsWhenThereIsNowhereToGo) {
 TEST_F(LostPosts, CountEventsThatLeaveTheirMessageForWantOfAClientID) {
   entry_.set("extras_on_internal", 1);
   entry_.set("event_blacklist", Array{9});
-  backend().setIsInternal(true);
-  backend().setUdid(nullptr);
+  facts_.isInternal = true;
+  facts_.udid = std::nullopt;
   flushTwo();
   EXPECT_EQ(dropped(Reason::postWithoutClientID), 2u);
   poster_->answer(0, 404);
@@ -510,8 +510,8 @@ TEST_F(LostPosts, CountEventsThatLeaveTheirMessageForWantOfAClientID) {
 TEST_F(LostPosts, CountNoEventThatLeftItsMessageTwice) {
   entry_.set("extras_on_internal", 1);
   entry_.set("expedite", 1);
-  backend().setIsInternal(true);
-  backend().setUdid(nullptr);
+  facts_.isInternal = true;
+  facts_.udid = std::nullopt;
   decided();
   send(5);
   EXPECT_EQ(dropped(Reason::postWithoutClientID), 1u);

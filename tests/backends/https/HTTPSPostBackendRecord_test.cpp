@@ -16,8 +16,10 @@ class HTTPSPostBackendRecord : public HTTPSFixture {
     return value != nullptr ? *value : Value();
   }
   Value sessionIDFor(int32_t clientType, bool internal) {
-    backend().setCompType(clientType);
-    backend().setIsInternal(internal);
+    facts_.compType = clientType;
+    facts_.isInternal = internal;
+    backend_.reset();
+    backend().setCombinedSessionIDString(String("12.77"));
     return entryOf(record(), "_sessionID");
   }
 };
@@ -60,7 +62,7 @@ TEST_F(HTTPSPostBackendRecord, HoldsThePayloadAndTheFixedKeysInOrder) {
 }
 
 TEST_F(HTTPSPostBackendRecord, CutsTheStartToItsMinuteAndAddsTheOffsetToThat) {
-  backend().setStartTimestamp({1000000123, 900000});
+  facts_.setStartTimestamp({1000000123, 900000});
   const Dictionary made = record({}, {1000000129, 400000});
   EXPECT_EQ(entryOf(made, "_startTS"), Value(1000000080));
   EXPECT_NEAR(entryOf(made, "_clientTS").doubleValue(), 1000000085.5, 1e-6);
@@ -68,14 +70,15 @@ TEST_F(HTTPSPostBackendRecord, CutsTheStartToItsMinuteAndAddsTheOffsetToThat) {
 }
 
 TEST_F(HTTPSPostBackendRecord, CutsANegativeStartTowardsZero) {
-  backend().setStartTimestamp({-90, 0});
+  facts_.setStartTimestamp({-90, 0});
   EXPECT_EQ(entryOf(record({}, {-90, 0}), "_startTS"), Value(-60));
 }
 
 TEST_F(HTTPSPostBackendRecord, ShowsTheMinorVersionOnlyWhenThereIsOne) {
-  backend().setSelfVersion("3.1");
+  facts_.setSelfVersion("3.1");
   EXPECT_EQ(entryOf(record(), "_reportVers"), Value("3.1"));
-  backend().setSelfVersion("3.1.2");
+  facts_.setSelfVersion("3.1.2");
+  backend_.reset();
   EXPECT_EQ(entryOf(record(), "_reportVers"), Value("3.1.2"));
 }
 
@@ -84,7 +87,6 @@ TEST_F(HTTPSPostBackendRecord, WithoutACombinedSessionIDHasNone) {
 }
 
 TEST_F(HTTPSPostBackendRecord, SomeClientTypesSendTheNumberOfTheirSession) {
-  backend().setCombinedSessionIDString(String("12.77"));
   EXPECT_EQ(sessionIDFor(7, false), Value(77u));
   EXPECT_EQ(sessionIDFor(11, false), Value("12.77"));
   EXPECT_EQ(sessionIDFor(11, true), Value(77u));
@@ -109,10 +111,10 @@ TEST_F(HTTPSPostBackendRecord, TheOneFixedKeyWithoutUnderscoreReplacesThePayload
 }
 
 TEST_F(HTTPSPostBackendRecord, LeavesOutWhatIsNotKnown) {
-  backend().setProductVersion(std::nullopt);
-  backend().setBuildVersion(std::nullopt);
-  backend().setHardwareType(std::nullopt);
-  backend().setProductFamily(std::nullopt);
+  facts_.productVersion = std::nullopt;
+  facts_.buildVersion = std::nullopt;
+  facts_.hardwareType = std::nullopt;
+  facts_.productFamily = std::nullopt;
   const Dictionary made = record();
   for (const char* key : {"_osVersion", "_build", "_productModel", "_productFamily"})
     EXPECT_FALSE(made.contains(key)) << key;
@@ -120,20 +122,15 @@ TEST_F(HTTPSPostBackendRecord, LeavesOutWhatIsNotKnown) {
 
 TEST_F(HTTPSPostBackendRecord, SaysWhetherTheBuildIsInternal) {
   platform_.deviceProperties.setProperty("ReleaseType", "Internal");
-  backend().setIsInternal(false);  // the device says it, not the session
+  facts_.isInternal = false;  // the device says it, not the session
   EXPECT_EQ(entryOf(record(), "_internal"), Value(1u));
 }
 
 TEST_F(HTTPSPostBackendRecord, AnImpossibleTimeIsMinusOne) {
-  struct Timeless final : HTTPSPostBackend {
-    Timeless(Configuration& configuration, double start)
-        : HTTPSPostBackend(configuration, "name", {}, std::nullopt) {
-      startTimeStamp_ = start;
-    }
-  };
   for (const double start : {std::nan(""), -HUGE_VAL, HUGE_VAL}) {
-    const auto timeless = std::make_shared<Timeless>(platform_.configuration, start);
-    const Dictionary made = timeless->newEventDictfromPayload({}, {1, 0}, 5, 2, EventID{});
+    facts_.startTimeStamp = start;
+    backend_.reset();
+    const Dictionary made = record({}, {1, 0});
     EXPECT_EQ(entryOf(made, "_clientTS"), Value(-1.0)) << start;
     EXPECT_EQ(entryOf(made, "eventTime"), Value(-1.0)) << start;
   }
@@ -200,7 +197,7 @@ TEST_F(HTTPSPostBackendRecord, OfAStopMessageSaysWhatTheEntryOverrides) {
 }
 
 TEST_F(HTTPSPostBackendRecord, OfAStopMessageWithoutThresholdSaysMinusOne) {
-  backend().setRequireUserInfo(false);
+  facts_.requireUserInfo = false;
   backend().setBatchEvents(false);
   decided();
   send(0, {}, 0, 1);

@@ -10,7 +10,8 @@ class HTTPSPostBackendState : public HTTPSFixture {
  protected:
   int32_t decide() { return backend().updateBackendState(); }
   std::shared_ptr<HTTPSPostBackend> init(std::optional<String> name, std::optional<Dictionary> profile) {
-    return HTTPSPostBackend::initWithName(platform_.configuration, name, profile, std::nullopt);
+    return HTTPSPostBackend::initWithName(platform_.configuration, name, profile,
+                                          std::make_shared<SessionFacts>());
   }
   bool logged(const char* text, LogLevel level = LogLevel::debug) const {
     return platform_.sink.contains(level, text);
@@ -96,7 +97,8 @@ TEST_F(HTTPSPostBackendState, AMissingNameMatchesOnlyAMissingList) {
 
 TEST_F(HTTPSPostBackendState, ComparesVersionsFieldByField) {
   const auto enabled = [this](const char* own, const char* since) {
-    backend().setSelfVersion(own);
+    facts_.setSelfVersion(own);
+    backend_.reset();
     return backend().isFrameworkEnabledForClient({{"enabledSince", since}});
   };
   EXPECT_TRUE(enabled("3.10.0", "3.2"));
@@ -159,17 +161,17 @@ TEST_F(HTTPSPostBackendState, ASessionThatNeedsNoUserInformationIsEnabledWhateve
   platform_.consent.setAllowed(false);
   userInfo_ = std::nullopt;
   entry_ = {{"client", "other"}, {"event_threshold", 7}};
-  backend().setRequireUserInfo(false);
+  facts_.requireUserInfo = false;
   EXPECT_EQ(decide(), kBackendStateEnabled);
   EXPECT_EQ(backend().eventThreshold(), 0);  // no entry had an address
   EXPECT_FALSE(backend().postURL());
 }
 
 TEST_F(HTTPSPostBackendState, ASessionThatNeedsNoUserInformationTakesTheFirstAddress) {
+  facts_.requireUserInfo = false;
   make({Dictionary{{"event_threshold", 1}},
         Dictionary{{"event_threshold", 2}, {"post_url", "https://two.example.org"}},
         Dictionary{{"event_threshold", 3}, {"post_url", "https://three.example.org"}}});
-  backend().setRequireUserInfo(false);
   EXPECT_EQ(decide(), kBackendStateEnabled);
   EXPECT_EQ(backend().postURL(), String("https://two.example.org"));
   EXPECT_EQ(backend().eventThreshold(), 2);
@@ -252,7 +254,7 @@ TEST_F(HTTPSPostBackendState, AListThatRefusesTheDeviceDoesNotGoOnToTheNextEntry
 
 TEST_F(HTTPSPostBackendState, AnUnknownModelIsInEveryBlacklist) {
   entry_.set("device_blacklist", Array{"phone8"});
-  backend().setHardwareType(std::nullopt);
+  facts_.hardwareType = std::nullopt;
   EXPECT_EQ(decide(), kBackendStateDisabled);
   EXPECT_TRUE(logged("HTTPSPostBackend(updateBackendState): ((null)) is in device blacklist [\"phone8\"]"));
 }
@@ -459,10 +461,11 @@ TEST_F(HTTPSPostBackendState, TheCustomIdentifierOfANamelessClientHasEmptyNames)
 }
 
 TEST_F(HTTPSPostBackendState, EntriesThatAreNoDictionariesAreSkipped) {
-  make({Value(1), Value("a"), entry_});
-  EXPECT_EQ(decide(), kBackendStateEnabled);
-  backend().setRequireUserInfo(false);
-  EXPECT_EQ(decide(), kBackendStateEnabled);
+  for (const bool required : {true, false}) {
+    facts_.requireUserInfo = required;
+    make({Value(1), Value("a"), entry_});
+    EXPECT_EQ(decide(), kBackendStateEnabled);
+  }
 }
 
 TEST_F(HTTPSPostBackendState, FollowsTheUserInformation) {
@@ -548,14 +551,16 @@ TEST_F(HTTPSPostBackendState, NoTypeInTheEntryDoesHarm) {
     for (const Value& kind : kinds) {
       Dictionary entry = entry_;
       entry.set(key, kind);
-      make({entry}).updateState();
-      EXPECT_GE(backend().state(), kBackendStateUndecided);
-      EXPECT_LE(backend().state(), kBackendStateHeld);
-      send(5);
-      send(6, {{"email", kind}}, 1);
-      backend().setRequireUserInfo(false);
-      backend().updateState();
-      backend().flushMessagesWithCompletion(nullptr);
+      for (const bool required : {true, false}) {
+        facts_.requireUserInfo = required;
+        make({entry}).updateState();
+        EXPECT_GE(backend().state(), kBackendStateUndecided);
+        EXPECT_LE(backend().state(), kBackendStateHeld);
+        send(5);
+        send(6, {{"email", kind}}, 1);
+        backend().updateState();
+        backend().flushMessagesWithCompletion(nullptr);
+      }
     }
   }
 }

@@ -45,9 +45,9 @@ TEST_F(WireExample, IsWhatIsPosted) {
   entry_ = dictionaryBlock("json entry");
   userInfo_ = dictionaryBlock("json userinfo");
   platform_.deviceProperties.setSecondsFromGMT(3600);
+  facts_.batchEvents = false;
+  facts_.setStartTimestamp({1000000123, 900000});
   HTTPSPostBackend& example = backend();
-  example.setBatchEvents(false);
-  example.setStartTimestamp({1000000123, 900000});
   example.setCorrelatedSessionID("12.77");
   example.setDigestKey(Data(std::string_view(key)));
   example.updateState();

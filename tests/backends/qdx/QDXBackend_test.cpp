@@ -18,8 +18,10 @@ namespace {
 class QDX : public testing::Test {
  protected:
   std::shared_ptr<QDXBackend> make(int32_t clientType = 7) {
+    SessionFacts facts;
+    facts.compType = clientType;
     return QDXBackend::initWithName(platform_.configuration, kKYTReportingBackendQDX, Dictionary{},
-                                    std::nullopt, clientType);
+                                    std::make_shared<SessionFacts>(facts));
   }
   // Through the operation that routed events go through.
   void send(QDXBackend& backend) {
@@ -57,7 +59,9 @@ TEST_F(QDX, IsRefusedToOthersWithALine) {
 }
 
 TEST_F(QDX, WithoutAClientTypeThereIsNone) {
-  EXPECT_EQ(QDXBackend::initWithName(platform_.configuration, "qdx", Dictionary{}, std::nullopt), nullptr);
+  EXPECT_EQ(QDXBackend::initWithName(platform_.configuration, "qdx", Dictionary{},
+                                     std::make_shared<SessionFacts>()),
+            nullptr);
   EXPECT_TRUE(
       logged(LogLevel::error, "QDXBackend(initWithName): No matching bundle found for client type 0"));
 }

@@ -63,10 +63,12 @@ class Upload : public testing::Test {
  protected:
   UploadBackend& backend() {
     if (backend_ == nullptr) {
+      SessionFacts facts;
+      facts.sessionID = 4294967295U;
+      facts.udid = String(udid_);
+      facts.productFamily = String("Phone");
       backend_ = UploadBackend::initWithName(platform_.configuration, kKYTReportingBackendUploadServer,
-                                             profile_, String("Phone"));
-      backend_->setSessionID(4294967295U);
-      backend_->setUdid("0123456789abcdef");
+                                             profile_, std::make_shared<SessionFacts>(facts));
       backend_->setReportingSessionConnectivityDelegate(poster_);
     }
     return *backend_;
@@ -84,13 +86,15 @@ class Upload : public testing::Test {
   TestPlatform platform_;
   std::shared_ptr<ThreadedPoster> poster_ = std::make_shared<ThreadedPoster>(reply("{}"));
   Dictionary profile_{{"post_url", "https://upload.example.org/in"}, {"display_url", "https://show"}};
+  const char* udid_ = "0123456789abcdef";
   std::shared_ptr<UploadBackend> backend_;
 };
 
 TEST_F(Upload, NeedsAnAddress) {
   for (const Dictionary& profile : {Dictionary{}, Dictionary{{"post_url", 7}}}) {
     platform_.sink.clear();
-    EXPECT_EQ(UploadBackend::initWithName(platform_.configuration, "uploadserver", profile, std::nullopt),
+    EXPECT_EQ(UploadBackend::initWithName(platform_.configuration, "uploadserver", profile,
+                                          std::make_shared<SessionFacts>()),
               nullptr);
     EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(initWithName): can't resolve upload post URL."));
   }
@@ -99,7 +103,7 @@ TEST_F(Upload, NeedsAnAddress) {
 TEST_F(Upload, TakesItsAddressesFromTheProfile) {
   EXPECT_EQ(backend().uploadURL(), String("https://upload.example.org/in"));
   EXPECT_EQ(backend().displayURL(), String("https://show"));
-  EXPECT_EQ(backend().productFamily(), String("Phone"));
+  EXPECT_EQ(backend().facts().productFamily, String("Phone"));
 }
 
 TEST_F(Upload, TakesNoEvents) {
@@ -334,13 +338,15 @@ TEST_F(Upload, TheFinishedAddressIsJudged) {
 TEST_F(Upload, AnIdentifierThatCanStandInNoAddressMakesNoRequest) {
   for (const char* udid : {"a b", "a\n", "a\x7f", "50%", "%zz"}) {
     platform_.sink.clear();
-    backend().setUdid(udid);
+    backend_ = nullptr;
+    udid_ = udid;
     EXPECT_FALSE(upload()) << udid;
     EXPECT_TRUE(logged(LogLevel::error, "UploadBackend(uploadFileAtPath): Unable to create URL request"))
         << udid;
   }
   EXPECT_TRUE(poster_->requests.empty());
-  backend().setUdid("a%20b");
+  backend_ = nullptr;
+  udid_ = "a%20b";
   EXPECT_TRUE(upload());
 }
 

@@ -40,12 +40,12 @@ TEST(UploadWireExample, IsWhatIsSent) {
   const auto poster = std::make_shared<AnsweringPoster>();
   TestPlatform platform;
   platform.fileExtensions.contents = file;
-  const auto backend =
-      UploadBackend::initWithName(platform.configuration, kKYTReportingBackendUploadServer,
-                                  Dictionary{{"post_url", "https://upload.example.org/in"}}, String("Phone"));
-  const std::string device = documentBlock("WIRE-UPLOAD.md", "text device");
-  backend->setSessionID(77);
-  backend->setUdid(device.c_str());
+  SessionFacts facts;
+  facts.sessionID = 77;
+  facts.udid = String(documentBlock("WIRE-UPLOAD.md", "text device"));
+  const auto backend = UploadBackend::initWithName(platform.configuration, kKYTReportingBackendUploadServer,
+                                                   Dictionary{{"post_url", "https://upload.example.org/in"}},
+                                                   std::make_shared<SessionFacts>(facts));
   backend->setReportingSessionConnectivityDelegate(poster);
   std::optional<FileExtension> extension;
   ASSERT_TRUE(backend->uploadFileAtPath("/tmp/reports/call #1.log", "token", extension));
