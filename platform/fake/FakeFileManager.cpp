@@ -77,6 +77,7 @@ std::optional<Error> FakeFileManager::createFile(const std::string& path) {
 }
 
 std::optional<Error> FakeFileManager::append(const std::string& path, std::string_view bytes) {
+  if (beforeAppend_) beforeAppend_();
   MutexLock lock(mutex_);
   const auto found = files_.find(path);
   if (found == files_.end()) return missing();

@@ -2,6 +2,7 @@
 // comes from the clock given. Any thread.
 #pragma once
 
+#include <functional>
 #include <map>
 #include <set>
 #include <string>
@@ -32,6 +33,8 @@ class FakeFileManager final : public FileManager {
 
   void put(const std::string& path, File file) EXCLUDES(mutex_);
   void setFaults(Faults faults) EXCLUDES(mutex_);
+  // Called by whoever appends, before that: what another does in between. Set before anybody writes.
+  void setBeforeAppend(std::function<void()> beforeAppend) { beforeAppend_ = std::move(beforeAppend); }
   [[nodiscard]] std::map<std::string, File> files() const EXCLUDES(mutex_);  // by path
   [[nodiscard]] bool hasFolder(const std::string& path) const EXCLUDES(mutex_);
 
@@ -49,6 +52,7 @@ class FakeFileManager final : public FileManager {
   void addFolders(std::string path) REQUIRES(mutex_);
 
   const Clock& clock_;
+  std::function<void()> beforeAppend_;
   mutable Mutex mutex_;
   std::map<std::string, File> files_ GUARDED_BY(mutex_);
   std::set<std::string> folders_ GUARDED_BY(mutex_);

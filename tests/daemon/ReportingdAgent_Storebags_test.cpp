@@ -138,6 +138,25 @@ TEST_F(AgentStorebags, ABadSignatureIsAFailureLikeAnyOther) {
   EXPECT_EQ(requests(), 1U);
 }
 
+// What a reply says about its lifetime counts for good ones alone.
+TEST_F(AgentStorebags, ABadReplyIsAskedForAgainAfterFifteenMinutesWhateverLifetimeItHas) {
+  for (const char* lifetime : {"max-age=86400", "max-age=1"}) {
+    const size_t before = requests();
+    test_.clientBundle.setResource("publicKey", "der", otherPublicKey());
+    serve(releaseBag(section_), {{"Cache-Control", lifetime}});
+    const Client a = clientWith(sessionInfo(5));
+    test_.clock.advance(std::chrono::hours(25));
+    EXPECT_EQ(storebag(a), before == 0 ? std::nullopt : std::optional(section_));
+    test_.clock.advance(std::chrono::seconds(899));
+    static_cast<void>(storebag(a));
+    EXPECT_EQ(requests(), before + 1) << lifetime;
+    test_.clientBundle.setResource("publicKey", "der", testPublicKey());
+    test_.clock.advance(std::chrono::seconds(1));
+    EXPECT_EQ(storebag(a), section_);
+    EXPECT_EQ(requests(), before + 2) << lifetime;
+  }
+}
+
 TEST_F(AgentStorebags, AFailedRefreshKeepsTheLastGoodSection) {
   const Client a = clientWith(sessionInfo(5));
   EXPECT_EQ(storebag(a), section_);
@@ -163,6 +182,7 @@ TEST_F(AgentStorebags, AnUnchangedBagCountsAsFetched) {
   EXPECT_EQ(storebag(a), section_);
   EXPECT_EQ(test_.urlSessions.requestHeader(1, "If-Modified-Since"), "yesterday");
   test_.clock.advance(std::chrono::seconds(999));
+  EXPECT_FALSE(logged(LogLevel::error, "Unable to fetch storebag"));
   EXPECT_EQ(storebag(a), section_) << "the age comes from the header alone: the bag's own is not read again";
   EXPECT_EQ(requests(), 2U);
 }

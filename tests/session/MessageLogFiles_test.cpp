@@ -223,6 +223,17 @@ TEST_F(MessageLogFilesTest, AFileThatCannotBeWrittenIsDeleted) {
   EXPECT_EQ(contents(), (std::map<std::string, std::string>{{logFile("1769860800"), line("text")}}));
 }
 
+TEST_F(MessageLogFilesTest, AFileThatAnotherCallHasDeletedIsNotDeletedAgain) {
+  put(logFile("1"), 10);
+  files_.setBeforeAppend([this] { static_cast<void>(files_.removeItem(logFile("1"))); });
+  write();
+  EXPECT_TRUE(contents().empty());
+  EXPECT_TRUE(logged(LogLevel::error, "writeToLogFile: Error writing to log file " + logFile("1")));
+  EXPECT_FALSE(sink_.contains("Cannot delete"));
+  EXPECT_FALSE(sink_.contains("Deleted expired"));
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 1U);
+}
+
 TEST_F(MessageLogFilesTest, AFileThatCannotBeDeletedIsNotSaidToBe) {
   put(logFile("1"), 90000);
   files_.setFaults({.remove = true});

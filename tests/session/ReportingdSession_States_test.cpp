@@ -31,6 +31,18 @@ TEST_F(SessionStates, ReportsAnEmptyListWhenNoBackEndIsLive) {
   EXPECT_EQ(configure({"httppost", "dashboard"}), Array());
 }
 
+// Others of a hierarchy write them too; a session of none need not wait for somebody's download.
+TEST_F(SessionStates, AreDecidedUnderTheAgentsLockInAHierarchyAlone) {
+  std::vector<bool> locked;
+  factory_.prepare = [&](RecordingBackend& made) {
+    made.onUpdateState = [&] { locked.push_back(delegate_.isLocked()); };
+  };
+  configure(client_, {"httppost"}, sessionInfo());
+  EXPECT_EQ(locked, std::vector<bool>{false});
+  configure(client_, {"httppost"}, sessionInfoAtLevel(0));
+  EXPECT_EQ(locked, (std::vector<bool>{false, true}));
+}
+
 TEST_F(SessionStates, CopiesTheParentsStateAndThreshold) {
   const Client parent = newConfigured({"httppost"}, sessionInfoAtLevel(0));
   factory_.latest("httppost")->setState(kBackendStateEnabled);

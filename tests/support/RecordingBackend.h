@@ -36,6 +36,7 @@ class RecordingBackend final : public KYTReportingBackend {
   bool acceptsFiles = false, acceptsLogData = false;
   uint64_t batchSize = 0;
   int32_t stateAfterUpdate = kBackendStateEnabled;
+  std::function<void()> onUpdateState;
   bool holdsFlushes = false;  // completions wait in `flushes`; otherwise they run at once
   Value flushResult;
   std::optional<Error> flushError;
@@ -83,6 +84,7 @@ class RecordingBackend final : public KYTReportingBackend {
     return acceptsLogData;
   }
   void updateState() override {
+    if (onUpdateState) onUpdateState();
     calls.emplace_back("updateState");
     ++updateCount;
     setState(stateAfterUpdate);
