@@ -1,10 +1,13 @@
 #include "config/DeviceIdentity.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cstring>
+#include <fstream>
 #include <string>
 #include <string_view>
 #include <thread>
@@ -88,29 +91,49 @@ TEST(DeviceIdentity, AsksForTheReleaseTypeOnce) {
   EXPECT_EQ(test.deviceProperties.queries("ReleaseType"), 1);
 }
 
+// Whether a thread of this process waits for something.
+bool waits(pid_t thread) {
+  std::ifstream status("/proc/self/task/" + std::to_string(thread) + "/status");
+  for (std::string line; std::getline(status, line);)
+    if (line.starts_with("State:")) return line.find('S') != std::string::npos;
+  return false;
+}
+
 // Each caller gets the answer of the device, also one that comes while the first is still asking.
 TEST(DeviceIdentity, AsksForTheReleaseTypeOnceUnderConcurrentFirstCalls) {
   constexpr int kCallers = 4;
   TestPlatform test;
   test.deviceProperties.setProperty("ReleaseType", "Internal");
   Semaphore released(0);
-  std::atomic<int> asked = 0, calling = 0;
+  std::atomic<int> asked = 0;
   test.deviceProperties.setOnQuery([&](std::string_view) {
     ++asked;
     released.wait();
   });
-  std::array<bool, kCallers> answers{};
+  struct Caller {
+    std::atomic<pid_t> thread = 0;
+    std::atomic<bool> answered = false;
+    bool answer = false;
+    [[nodiscard]] bool hasComeToRest() const { return answered || (thread != 0 && waits(thread)); }
+  };
+  std::array<Caller, kCallers> callers;
   {
     std::vector<std::jthread> threads;
-    for (bool& answer : answers)
+    for (Caller& caller : callers)
       threads.emplace_back([&] {
-        ++calling;
-        answer = test.deviceIdentity.isInternalBuild();
+        caller.thread = ::gettid();
+        caller.answer = test.deviceIdentity.isInternalBuild();
+        caller.answered = true;
       });
-    EXPECT_TRUE(eventually([&] { return calling == kCallers && asked >= 1; }));
+    // The one that asks, and the others, which wait for it.
+    EXPECT_TRUE(eventually([&] {
+      return asked >= 1 && std::all_of(callers.begin(), callers.end(),
+                                       [](const Caller& caller) { return caller.hasComeToRest(); });
+    }));
+    for (const Caller& caller : callers) EXPECT_FALSE(caller.answered) << "before the device has answered";
     for (int i = 0; i < kCallers; ++i) released.signal();
   }
-  for (const bool answer : answers) EXPECT_TRUE(answer);
+  for (const Caller& caller : callers) EXPECT_TRUE(caller.answer);
   EXPECT_EQ(asked, 1);
 }
 
