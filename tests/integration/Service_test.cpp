@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "platform/linux/base/Descriptors.h"
-#include "tests/integration/DaemonProcess.h"
+#include "tests/integration/FailingDaemon.h"
 #include "tests/integration/TestClient.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/OrdinaryUser.h"
@@ -140,17 +140,21 @@ TEST_F(Service, LeavesWhoComesAfterItsDecisionToEndToTheNextOne) {
   EXPECT_EQ(statusAfterReading(manager_), 0) << daemon_.log();
 }
 
+// Its idle time is over and a client is at its door when it may run again: whichever it sees first.
 TEST_F(Service, CutsNobodyWhoComesAtTheMomentOfItsEnd) {
   daemon_.writeSettings(
       "[storebag]\ninternal_host = \"http://127.0.0.1:9\"\npublic_host = \"http://127.0.0.1:9\"\n"
-      "[log]\ntarget = \"stderr\"\n[service]\nidle_exit_seconds = 0.02\n");
+      "[log]\ntarget = \"stderr\"\n[service]\nidle_exit_seconds = 0.1\n");
   daemon_.activateBySocket();
-  for (int round = 0; round < 30; ++round) {
+  for (int round = 0; round < 20; ++round) {
     daemon_.start({"--log-level", "default"});
-    // Each round comes a little later than the one before, around the moment of the end.
-    const auto comes = std::chrono::steady_clock::now() + std::chrono::milliseconds(20 + 2 * round);
-    ASSERT_TRUE(eventually([&] { return std::chrono::steady_clock::now() >= comes; }));
+    ASSERT_TRUE(eventually([&] { return daemon_.logged("main: Listener resumes"); })) << daemon_.log();
+    daemon_.terminate(SIGSTOP);
+    const auto over = std::chrono::steady_clock::now() + std::chrono::milliseconds(100);
+    ASSERT_TRUE(eventually([&] { return std::chrono::steady_clock::now() >= over; }));
     TestClient client(daemon_.socketPath(), 5);
+    ASSERT_TRUE(daemon_.isWantedBySomeone());
+    daemon_.terminate(SIGCONT);
     auto answer = std::async(std::launch::async, [&] { return client.configure(); });
     while (answer.wait_for(20ms) != std::future_status::ready)
       if (daemon_.hasEnded()) {
@@ -162,6 +166,32 @@ TEST_F(Service, CutsNobodyWhoComesAtTheMomentOfItsEnd) {
     client.close();
     EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
   }
+}
+
+// A client is being accepted while the idle time ends: it is not there yet when the daemon looks for the first time.
+TEST_F(Service, LooksAgainAtItsConnectionsOnceItHasStoppedAccepting) {
+  if (kSanitized) GTEST_SKIP() << "a sanitizer's own library must be loaded first";
+  FailingDaemon daemon("http://127.0.0.1:9");
+  daemon.writeSettings(
+      "[storebag]\ninternal_host = \"http://127.0.0.1:9\"\npublic_host = \"http://127.0.0.1:9\"\n"
+      "[log]\ntarget = \"stderr\"\n[service]\nidle_exit_seconds = 2\n");
+  daemon.activateBySocket();
+  ASSERT_TRUE(daemon.startAndWait()) << daemon.log();
+  const auto idleEnds = std::chrono::steady_clock::now() + 2s;
+  daemon.fail(kyt_failing_accept4, kyt_failing_hangs);
+  TestClient first(daemon.socketPath(), 5);
+  ASSERT_TRUE(eventually([&] { return daemon.failures() == 1 || daemon.hasEnded(); }));
+  ASSERT_TRUE(eventually([&] { return std::chrono::steady_clock::now() >= idleEnds + 200ms; }));
+  ASSERT_FALSE(daemon.hasEnded()) << "it ended before it could be held up";
+  daemon.goOn();
+  EXPECT_EQ(first.configure(), "none") << daemon.log();
+  TestClient second(daemon.socketPath(), 6);
+  EXPECT_EQ(second.configure(), "none") << daemon.log();
+  EXPECT_EQ(first->statistics().connections, 1U) << daemon.log();
+  EXPECT_FALSE(daemon.logged("main: Ending")) << "both are served by the one";
+  first.close();
+  second.close();
+  EXPECT_EQ(daemon.exitStatus(), 0) << daemon.log();
 }
 
 TEST_F(Service, IsStartedBySystemdsOwnSocketActivation) {

@@ -56,8 +56,10 @@ static int fails(enum kyt_failing_call call) {
   const int number = __atomic_add_fetch(&shared->seen, 1, __ATOMIC_RELAXED);
   if (number < shared->first || number - shared->first >= shared->times) return 0;
   __atomic_add_fetch(&shared->failed, 1, __ATOMIC_RELAXED);
-  const struct timespec while_it_lasts = {1, 0};
-  while (shared->error == kyt_failing_hangs) nanosleep(&while_it_lasts, NULL);
+  const struct timespec while_it_lasts = {0, 10000000};
+  while (__atomic_load_n(&shared->error, __ATOMIC_ACQUIRE) == kyt_failing_hangs)
+    nanosleep(&while_it_lasts, NULL);
+  if (shared->error == 0) return 0;
   errno = shared->error;
   return 1;
 }

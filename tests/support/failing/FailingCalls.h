@@ -23,7 +23,7 @@ enum kyt_failing_call {
 };
 /* clang-format on */
 
-/* Instead of an errno: the call never returns. */
+/* Instead of an errno: the call does not return while this stands. Then it is made, if 0 stands there. */
 #define kyt_failing_hangs (-1)
 
 /* In a file that both map; its name is in the environment as KYT_FAILING_CALLS. */
