@@ -7,6 +7,7 @@
 #include <array>
 #include <cstdlib>
 #include <functional>
+#include <future>
 #include <set>
 #include <sstream>
 #include <string>
@@ -88,6 +89,33 @@ TEST_F(ClientDebugLines, ShowStateChangesAndDropsWhenAskedFor) {
                 begin + "dropped 1: session-closed (1 in all)"}));
   EXPECT_EQ(linesOf("0", session), "");
   EXPECT_EQ(linesOf(nullptr, session), "");
+}
+
+TEST_F(ClientDebugLines, ShowAFullQueueAndACallThatWaitedTooLong) {
+  const std::string text = linesOf("1", [this] {
+    KYTReporting::Options small = options();
+    small.maxQueuedMessages = 64;
+    small.callDeadline = std::chrono::milliseconds(20);
+    const auto made = KYTReporting::open(std::move(small));
+    std::promise<void> flushed;
+    made->flush([&](const Value&, const auto&) { flushed.set_value(); });
+    while (made->sendMessage(1, 1, {})) {
+    }
+    flushed.get_future().wait();
+  });
+  EXPECT_NE(text.find("dropped 1: queue-full (1 in all)\n"), std::string::npos) << text;
+  EXPECT_NE(text.find("dropped 1: waited-too-long (1 in all)\n"), std::string::npos) << text;
+}
+
+TEST_F(ClientDebugLines, ShowWhatCannotBeSaidAgain) {
+  TestDaemon daemon(socket_);
+  ASSERT_TRUE(daemon.start());
+  const std::string text = linesOf("1", [this] {
+    KYTReporting::Options huge = options();
+    huge.userInfo = Dictionary{{"ClientName", std::string(2000000, 'x')}};
+    (void)KYTReporting::open(std::move(huge))->finish(kTestDeadline);
+  });
+  EXPECT_NE(text.find("dropped 1: replay-failed (1 in all)\n"), std::string::npos) << text;
 }
 
 TEST_F(ClientDebugLines, ShowAForgottenConfiguration) {

@@ -150,6 +150,19 @@ TEST_F(ClientReplay, SendsNothingForASessionThatCannotSayWhoItIs) {
   EXPECT_EQ(daemon_.calls(), std::vector<std::string>());
 }
 
+TEST_F(ClientReplay, CountsWhatTheDaemonThatCameBackRefuses) {
+  ASSERT_TRUE(daemon_.start());
+  const auto session = KYTReporting::open(options());
+  session->startConfiguration();
+  ASSERT_TRUE(allTaken(*session));
+  daemon_.setAnswersConfigurations(false);
+  EXPECT_EQ(toldAgain(*session), (std::vector<std::string>{"SetSessionInfo 42", "StartConfig", "Flush"}));
+  EXPECT_EQ(session->statistics().replayFailed, 1U);
+  session->startConfiguration();
+  ASSERT_TRUE(allTaken(*session));
+  EXPECT_EQ(session->statistics().replayFailed, 1U) << "only what is said again";
+}
+
 TEST_F(ClientReplay, CountsUserInformationThatCanNeverBeSent) {
   ASSERT_TRUE(daemon_.start());
   KYTReporting::Options huge = options();

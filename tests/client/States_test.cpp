@@ -1,8 +1,13 @@
 // What a session's program is told about where it stands, and how long its calls wait for a daemon.
 #include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
+#include <atomic>
 #include <future>
 #include <mutex>
+#include <thread>
 
 #include "kytreporting/KYTReporting.h"
 #include "kytreporting/kytreporting.h"
@@ -46,6 +51,16 @@ class ClientStates : public testing::Test {
     std::promise<std::optional<Error>> flushed;
     session.flush([&](const Value&, std::optional<Error> error) { flushed.set_value(std::move(error)); });
     return answerOf(flushed);
+  }
+
+  // At the socket's path, and nobody listens.
+  int staleSocket() const {
+    const int made = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    socket_.copy(address.sun_path, sizeof address.sun_path - 1);
+    EXPECT_EQ(bind(made, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    return made;
   }
 
   TemporaryFolder folder_;
@@ -219,10 +234,22 @@ TEST_F(ClientStates, FinishWaitsForADaemonThatTookSomethingAndDied) {
   const auto session = KYTReporting::open(options());
   ASSERT_TRUE(becomes(*session, State::connected));
   daemon_.stop();
-  ASSERT_TRUE(becomes(*session, State::noDaemon));
+  ASSERT_TRUE(eventually([&] { return wasTold("no-daemon: " + socket_ + ": No such file or directory"); }));
   EXPECT_TRUE(session->sendMessage(1, 1, {}));
   std::promise<bool> finished;
-  std::thread finishing([&] { finished.set_value(session->finish(kTestDeadline)); });
+  std::atomic<bool> over{false};
+  std::thread finishing([&] {
+    const bool taken = session->finish(kTestDeadline);
+    over = true;
+    finished.set_value(taken);
+  });
+  EXPECT_TRUE(eventually([&] { return session->statistics().queued == 2 || over; }));
+  // Another reason shows that it goes on trying.
+  const int stale = staleSocket();
+  EXPECT_TRUE(eventually([&] { return wasTold("no-daemon: " + socket_ + ": Connection refused") || over; }));
+  EXPECT_FALSE(over) << "it gave up";
+  close(stale);
+  unlink(socket_.c_str());
   ASSERT_TRUE(daemon_.start());
   EXPECT_TRUE(answerOf(finished));
   finishing.join();
@@ -360,6 +387,43 @@ TEST_F(ClientStates, AreTheSameInC) {
   EXPECT_EQ(figures.dropped_invalid, 1U);
   kyt_session_close(session);
   EXPECT_EQ(kyt_session_state(nullptr), KYT_STATE_NO_DAEMON);
+}
+
+TEST_F(ClientStates, FinishWaitsForADaemonInCToo) {
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = socket_.c_str();
+  options.finish_waits_for_daemon = 1;
+  kyt_session* session = kyt_session_open(&options);
+  EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 1);
+  std::atomic<bool> over{false};
+  std::promise<bool> finished;
+  std::thread finishing([&] {
+    const bool taken = kyt_session_finish(session, 60000) == 1;
+    over = true;
+    finished.set_value(taken);
+  });
+  const auto says = [&](const char* text) {
+    char reason[256];
+    kyt_session_state_reason(session, reason, sizeof reason);
+    return std::string(reason).ends_with(text);
+  };
+  const auto queued = [&] {
+    kyt_statistics figures{};
+    kyt_session_statistics(session, &figures);
+    return figures.queued;
+  };
+  EXPECT_TRUE(eventually([&] { return (queued() == 2 && says(": No such file or directory")) || over; }));
+  const int stale = staleSocket();
+  EXPECT_TRUE(eventually([&] { return says(": Connection refused") || over; }));
+  EXPECT_FALSE(over) << "it gave up";
+  close(stale);
+  unlink(socket_.c_str());
+  ASSERT_TRUE(daemon_.start());
+  EXPECT_TRUE(answerOf(finished));
+  finishing.join();
+  kyt_session_close(session);
+  EXPECT_EQ(daemon_.count("Send"), 1U);
 }
 
 TEST_F(ClientStates, FailCallbacksOfCAtTheirDeadlineToo) {

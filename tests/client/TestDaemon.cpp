@@ -24,7 +24,7 @@ class RecordingSession final : public ClientSessionInterface {
   }
   void startConfigWithCompletionHandler(StatesReply reply) override {
     record_->add("StartConfig");
-    reply(record_->states);
+    if (record_->answersConfiguration) reply(record_->states);
   }
   void fetchStatesWithUserInfo(std::optional<Dictionary> user, StatesReply reply) override {
     record_->add(user ? "FetchStates " + numberAt(*user, "ClientName") : "FetchStates none");
@@ -124,6 +124,7 @@ bool TestDaemon::listenerShouldAcceptNewConnection(Listener&, const std::shared_
   if (!connection->entitlementValue(kEntitlement).boolValue()) return false;
   auto record = std::make_shared<RecordedCalls>();
   record->holdFlush = holdFlush_;
+  record->answersConfiguration = answersConfigurations_;
   const std::lock_guard lock(mutex_);
   record->states = states_;
   connection->setExportedObject(std::make_shared<RecordingSession>(record));

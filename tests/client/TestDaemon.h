@@ -27,6 +27,7 @@ struct RecordedCalls {
   std::vector<std::string> calls;
   Dictionary lastPayload;
   bool holdFlush = false;
+  bool answersConfiguration = true;
   std::optional<Array> states;
   std::vector<ResultReply> heldFlushes;
   Connection* connection = nullptr;
@@ -54,6 +55,8 @@ class TestDaemon final : public ListenerDelegate, private Entitlements {
     states_ = std::move(states);
   }
   void setHoldFlush(bool hold) { holdFlush_ = hold; }
+  // Whether configurations of later connections are answered, or end in an error.
+  void setAnswersConfigurations(bool answers) { answersConfigurations_ = answers; }
 
   [[nodiscard]] size_t connections() const;
   // All calls of all connections so far, in order.
@@ -72,7 +75,7 @@ class TestDaemon final : public ListenerDelegate, private Entitlements {
 
   struct Running;
   const std::string path_;
-  std::atomic<bool> accepts_{true}, holdFlush_{false};
+  std::atomic<bool> accepts_{true}, holdFlush_{false}, answersConfigurations_{true};
   std::atomic<int> refusals_{0}, endings_{0};
   std::atomic<bool> entitled_{true};
   std::optional<Array> states_ = Array{"httppost", "qrs"};
