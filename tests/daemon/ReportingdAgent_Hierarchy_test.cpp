@@ -273,6 +273,23 @@ TEST_F(AgentHierarchy, TokensOfOneUserAreLimited) {
   EXPECT_TRUE(clientWith(sessionInfoAt(0, "E"), false, 1001).session->hierarchyToken()) << "another user's";
 }
 
+TEST_F(AgentHierarchy, TokensOfOneUserTakeOfHisMemory) {
+  test_.budget.shares()[Share::bytes] = 8000;
+  const auto account = test_.budget.account(1000);
+  clientWith(sessionInfoAt(0, "A"));
+  const uint64_t one = account->holds(Share::bytes);
+  EXPECT_GE(one, 500U);
+  account->takeAnyway(Share::bytes, 6000 - one);  // three quarters are for what can be refused
+  const Client refused = clientWith(sessionInfoAt(1, "B", 7));
+  EXPECT_FALSE(refused.session->hierarchyToken());
+  EXPECT_EQ(account->holds(Share::bytes), 6000U);
+  EXPECT_EQ(account->holds(Share::hierarchyTokens), 1U) << "a refused one is not counted";
+  EXPECT_EQ(test_.counters.value(Reason::userBytesExceeded), 1U);
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "updateCorrelatedSessions: User 1000 holds too many bytes for another hierarchy token: "
+                     "session 7 counts as standalone"));
+}
+
 TEST_F(AgentHierarchy, ATokenCountsOnceHoweverManySessionsJoinItAndHoweverOften) {
   test_.budget.shares()[Share::hierarchyTokens] = 2;
   Client a = clientWith(sessionInfoAt(0, "A")), child = clientWith(sessionInfoAt(1, "A"));

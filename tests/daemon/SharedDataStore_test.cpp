@@ -87,6 +87,26 @@ TEST(SharedDataStore, ManyEmptyEntriesPassTheLimitToo) {
   EXPECT_LT(accepted, 100);
 }
 
+TEST(SharedDataStore, TakesOfItsUsersMemory) {
+  Limits limits;
+  limits.maxSharedDataBytesPerUser = 1u << 20;
+  limits.maxBytesPerUser = 10000;
+  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  SharedDataStore store(budget);
+  const auto account = budget.account(kOne);
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(5000, 'x')}}, kOne));
+  const uint64_t held = account->holds(Share::bytes);
+  EXPECT_GE(held, 5000U);
+  EXPECT_FALSE(store.update("T", Dictionary{{"l", std::string(3000, 'x')}}, kOne));
+  EXPECT_EQ(account->holds(Share::bytes), held);
+  EXPECT_EQ(store.bytesOfUser(kOne), held) << "what was refused counts nowhere";
+  EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(6000, 'y')}}, kOne))
+      << "in the place of the former";
+  EXPECT_EQ(account->holds(Share::bytes), held + 1000);
+  store.removeToken("T");
+  EXPECT_EQ(account->holds(Share::bytes), 0U);
+}
+
 TEST(SharedDataStore, WhatIsRemovedIsChargedNoMore) {
   Limits limits;
   limits.maxSharedDataBytesPerUser = 10000;

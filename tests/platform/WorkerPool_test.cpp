@@ -66,6 +66,27 @@ TEST(WorkerPool, SaysWhenItIsQuiet) {
   }
 }
 
+TEST(WorkerPool, SaysOnceThatItIsQuietWhereSeveralWorkersEnd) {
+  WorkerPoolOptions o = options(2);
+  o.idleExit = std::chrono::milliseconds(20);
+  o.whenQuiet = [] { ++timesQuiet; };
+  timesQuiet = 0;
+  WorkerPool pool(o);
+  auto one = SerialQueue::create("one", pool), other = SerialQueue::create("other", pool);
+  Semaphore running, goOn;
+  for (const auto& queue : {one, other})
+    queue->async([&] {
+      running.signal();
+      goOn.wait();
+    });
+  ASSERT_TRUE(running.waitFor(kDeadline) && running.waitFor(kDeadline));
+  EXPECT_EQ(pool.figures().workers, 2U);
+  goOn.signal();
+  goOn.signal();
+  EXPECT_TRUE(eventually([&] { return pool.figures().workers == 0; }));
+  EXPECT_EQ(timesQuiet, 1);
+}
+
 // Work that comes while the last worker says so is done, also where the system refuses another.
 TEST(WorkerPool, WorkThatComesWhileItGetsQuietIsDone) {
   static Semaphore quiet, goOn;

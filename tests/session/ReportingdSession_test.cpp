@@ -455,5 +455,59 @@ TEST_F(SessionFixture, CountsTheInformationOfASingleMessageToo) {
   EXPECT_EQ(test_.counters.value(Reason::sessionInfoKeyUnknown), 1U);
 }
 
+class SessionInformation : public SessionFixture {
+ protected:
+  // A session of a user whose clients may hold so many bytes.
+  Client clientOfUser(uint64_t bytes) {
+    test_.budget.shares()[Share::bytes] = bytes;
+    account_ = test_.budget.account(1000);
+    auto connection =
+        std::make_shared<FakeConnection>(SerialQueue::create("test.connection", test_.executor), 1000);
+    connection->setUserAccount(account_);
+    connection->resume();
+    auto session = ReportingdSession::initWithSessionDelegate(delegate_, connection, class_);
+    return {std::move(connection), std::move(session)};
+  }
+  [[nodiscard]] uint64_t held() const { return account_->holds(Share::bytes); }
+
+  std::shared_ptr<UserAccount> account_;
+};
+
+TEST_F(SessionInformation, CountsTowardsItsUserUntilTheEnd) {
+  const Client client = clientOfUser(1u << 20);
+  Dictionary user = userInfo();
+  client.session->setSessionInfo(sessionInfo(), user, nullptr, false);
+  EXPECT_EQ(held(), 0U) << "so little counts with the connection";
+  user.set("more", std::string(100000, 'x'));
+  client.session->setSessionInfo(sessionInfo(), user, nullptr, false);
+  EXPECT_GE(held(), 100000U);
+  EXPECT_LT(held(), 110000U) << "once";
+  client.session->setSessionInfo(sessionInfo(), userInfo(), Value(std::string(200000, 'f')), false);
+  EXPECT_GE(held(), 200000U);
+  client.session->setDigestKey(Data(std::string(50000, 'k')), 0);
+  EXPECT_GE(held(), 250000U);
+  client.session->dealloc();
+  EXPECT_EQ(held(), 0U);
+}
+
+TEST_F(SessionInformation, WithoutRoomEndsItsConnection) {
+  const Client client = clientOfUser(50000);
+  Dictionary user = userInfo();
+  user.set("more", std::string(40000, 'x'));
+  client.session->setSessionInfo(sessionInfo(), user, nullptr, false);
+  test_.executor.runAll();
+  EXPECT_FALSE(client.connection->invalidated());
+  user.set("more", std::string(60000, 'x'));
+  client.session->setSessionInfo(sessionInfo(), user, nullptr, false);
+  test_.executor.runAll();
+  EXPECT_TRUE(client.connection->invalidated());
+  EXPECT_GE(held(), 60000U) << "it is there until the session ends";
+  EXPECT_EQ(test_.counters.value(Reason::userBytesExceeded), 1U);
+  EXPECT_TRUE(logged(LogLevel::error,
+                     "setSessionInfo: User 1000 holds too many bytes for the information of session 42"));
+  client.session->dealloc();
+  EXPECT_EQ(held(), 0U);
+}
+
 }  // namespace
 }  // namespace kyt

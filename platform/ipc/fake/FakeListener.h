@@ -33,6 +33,7 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
 
   // What a test prepares and asks.
   void setEntitlement(std::string_view key, Value value);
+  void setUserAccount(std::shared_ptr<UserAccount> account) { account_ = std::move(account); }
   void setDescription(std::string description) { description_ = std::move(description); }
   // From now on sendMessageToClient fails with this (none: succeeds again).
   void setSendError(std::optional<Error> error);
@@ -60,6 +61,7 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
   [[nodiscard]] Value entitlementValue(std::string_view key) override;
   [[nodiscard]] std::string description() const override { return description_; }
   [[nodiscard]] uint32_t peerUser() const override { return user_; }
+  [[nodiscard]] std::shared_ptr<UserAccount> userAccount() const override { return account_; }
   void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
   void setInterruptionHandler(Task handler) override;
   void setInvalidationHandler(Task handler) override;
@@ -77,6 +79,7 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
                                                          std::optional<Dictionary> payload) override;
   const std::shared_ptr<SerialQueue> queue_;
   const uint32_t user_;
+  std::shared_ptr<UserAccount> account_;  // none: nothing is counted
   std::string description_;
   const std::shared_ptr<State> state_;  // pending work on the queue outlives the connection
 };
