@@ -219,6 +219,7 @@ class EpollReactor::Implementation : public std::enable_shared_from_this<Impleme
   std::map<TimerKey, std::shared_ptr<Timer>> timersByDue_ GUARDED_BY(mutex_);
   std::set<TimerKey> timersByLatest_ GUARDED_BY(mutex_);
   MonotonicTime alarmAt_ GUARDED_BY(mutex_){};  // zero: not set
+  std::atomic<bool> alarmRefused_{false};
   uint64_t nextTimer_ GUARDED_BY(mutex_) = 0;
 };
 
@@ -290,7 +291,7 @@ void EpollReactor::Implementation::handleEvents(int count) {
       dispatch(event.data.u64, event.events);
     }
   }
-  if (due && !stopping_) fireTimers();
+  if ((due || alarmRefused_.load(std::memory_order_relaxed)) && !stopping_) fireTimers();
 }
 
 // Returns what to run here; everything else is with its executor.
@@ -445,7 +446,13 @@ void EpollReactor::Implementation::setAlarm() {
   itimerspec setting{};  // all zero: off
   setting.it_value.tv_sec = static_cast<time_t>(whole.count());
   setting.it_value.tv_nsec = static_cast<long>((sinceEpoch - whole).count());
-  timerfd_settime(alarm_.get(), TFD_TIMER_ABSTIME, &setting, nullptr);
+  // Without the alarm no timer would fire any more, later ones neither. Refused for longer than this, it is asked for
+  // again at the next event and with the next timer.
+  constexpr int kTries = 10;
+  int tries = 0;
+  while (timerfd_settime(alarm_.get(), TFD_TIMER_ABSTIME, &setting, nullptr) != 0 && tries < kTries) ++tries;
+  alarmRefused_ = tries == kTries;
+  if (alarmRefused_) alarmAt_ = {};
 }
 
 void EpollReactor::Implementation::fireTimers() {

@@ -9,10 +9,13 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
+#include <filesystem>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <system_error>
 #include <thread>
 
 #include "platform/Semaphore.h"
@@ -268,6 +271,30 @@ TEST_F(EpollTimersTest, SharesAWakeUpAmongTimersWithLeeway) {
   // All were due before the first one's leeway was over, and so it is in each round that a slow machine adds.
   const uint64_t wakeUps = reactor_->wakeUps() - before;
   EXPECT_LE(wakeUps, (std::chrono::steady_clock::now() - begin) / 60ms + 1);
+}
+
+// The alarm's descriptor of the reactor that was made last.
+int alarmDescriptor() {
+  int found = -1;
+  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    std::error_code gone;
+    if (std::filesystem::read_symlink(entry, gone) == "anon_inode:[timerfd]")
+      found = std::max(found, std::stoi(entry.path().filename()));
+  }
+  return found;
+}
+
+TEST_F(EpollTimersTest, FiresAlsoThoseWhoseAlarmTheSystemRefusedForAMoment) {
+  const int alarm = alarmDescriptor();
+  ASSERT_GE(alarm, 0);
+  const Descriptor kept = ownDescriptor(::dup(alarm)), noAlarm = ownDescriptor(::open("/dev/null", O_RDONLY));
+  Semaphore first, second;
+  ASSERT_EQ(::dup2(noAlarm.get(), alarm), alarm);
+  const TimerHandle refused = reactor_->after(1ms, queue_, [&] { first.signal(); });
+  ASSERT_EQ(::dup2(kept.get(), alarm), alarm);
+  const TimerHandle later = reactor_->after(2ms, queue_, [&] { second.signal(); });
+  EXPECT_TRUE(first.waitFor(kTestDeadline));
+  EXPECT_TRUE(second.waitFor(kTestDeadline));
 }
 
 TEST_F(EpollTimersTest, DoesNotMakeUpForMissedTicks) {
