@@ -81,6 +81,13 @@ bool isHere(sockaddr_storage address) {
 
 }  // namespace
 
+std::optional<uint64_t> bytesWritten(int socket) {
+  int unacknowledged = 0;
+  const std::optional<Figures> figures = figuresOf(socket);
+  if (!figures || ioctl(socket, SIOCOUTQ, &unacknowledged) != 0) return std::nullopt;
+  return figures->acknowledged + static_cast<uint64_t>(unacknowledged);
+}
+
 bool URLConnection::isBetween(const char* local, int localPort, const char* peer, int peerPort) {
   if (isOver_) return false;
   if (connected_) return isAddress(local_, local, localPort) && isAddress(peer_, peer, peerPort);
@@ -100,11 +107,8 @@ bool URLConnection::isStillThere() const {
 }
 
 URLConnection::Mark URLConnection::mark() const {
-  int unacknowledged = 0;
-  if (isOver_) return {};
-  const std::optional<Figures> figures = figuresOf(socket_);
-  if (!figures || ioctl(socket_, SIOCOUTQ, &unacknowledged) != 0) return {};
-  return {true, figures->acknowledged + static_cast<uint64_t>(unacknowledged)};
+  const std::optional<uint64_t> written = isOver_ ? std::nullopt : bytesWritten(socket_);
+  return written ? Mark{true, *written} : Mark{};
 }
 
 void URLConnection::look() {

@@ -26,6 +26,9 @@ namespace kyt {
 
 class URLTransfer;
 
+// How many bytes have been written to a TCP socket, whether they have arrived or not.
+[[nodiscard]] std::optional<uint64_t> bytesWritten(int socket);
+
 class URLConnection {
  public:
   // `interface`: that it is bound to; empty: to none. `peer`: that it is to lead to.

@@ -19,6 +19,7 @@ namespace {
 constexpr uint64_t kWake = ~uint64_t{0};
 constexpr uint64_t kRoutes = kWake - 1;  // as in UrlNetworkWaiting.cpp
 constexpr Duration kRefusedPause = std::chrono::milliseconds(10);
+constexpr Duration kRest = std::chrono::milliseconds(200);
 constexpr Duration kStopPatience = std::chrono::seconds(5);
 
 MonotonicTime currentTime() {
@@ -59,7 +60,9 @@ URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counte
           },
           this),
       slowRetry_(
-          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->waitingTimer(); }, this) {}
+          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->waitingTimer(); }, this),
+      rest_(
+          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->sockets_.wake(); }, this) {}
 
 URLNetwork::~URLNetwork() {
   if (epoll_ >= 0) close(epoll_);
@@ -244,7 +247,10 @@ void URLNetwork::handleEvent(uint64_t which, uint32_t events) {
     return;
   }
   const int socket = static_cast<int>(which);
-  if (URLConnectionPool* pool = sockets_.poolOf(socket)) pool->socketReady(socket, events);
+  if (URLConnectionPool* pool = sockets_.poolOf(socket)) {
+    pool->socketReady(socket, events);
+    if (sockets_.restsAfter(socket, events) && !rest_.isSet()) rest_.set(now_ + kRest);
+  }
 }
 
 void URLNetwork::takeCommands() {

@@ -4,9 +4,17 @@
 #include <sys/epoll.h>
 
 #include <cerrno>
+#include <optional>
 #include <utility>
 
+#include "platform/linux/url/UrlConnection.h"
+
 namespace kyt {
+namespace {
+
+constexpr uint8_t kMostInVain = 8;
+
+}  // namespace
 
 WatchedSockets::Watched& WatchedSockets::at(int socket) {
   const auto index = static_cast<size_t>(socket);
@@ -15,11 +23,11 @@ WatchedSockets::Watched& WatchedSockets::at(int socket) {
 }
 
 void WatchedSockets::opened(int socket) {
-  at(socket) = {nullptr, 0, turn_, 0, true};
+  at(socket) = {nullptr, 0, turn_, 0, true, false, 0, 0};
 }
 
 void WatchedSockets::closed(int socket) {
-  at(socket) = {nullptr, 0, turn_, 0, false};
+  at(socket) = {nullptr, 0, turn_, 0, false, false, 0, 0};
 }
 
 URLConnectionPool* WatchedSockets::poolOf(int socket) {
@@ -46,12 +54,16 @@ void WatchedSockets::watch(URLConnectionPool& pool, int socket, int what) {
     // one is seen to at its next event.
     watched.events = 0;
     watched.ours = false;
+    watched.rests = false;
     return;
   }
   const uint32_t wanted = ((what & CURL_POLL_IN) != 0 ? uint32_t{EPOLLIN} : 0) |
                           ((what & CURL_POLL_OUT) != 0 ? uint32_t{EPOLLOUT} : 0);
   watched.pool = &pool;
-  if (watched.events == wanted || tell(watched, socket, wanted)) return;
+  if (watched.events == wanted) return;
+  watched.rests = false;
+  watched.inVain = 0;
+  if (tell(watched, socket, wanted)) return;
   watched.refused = wanted;
   refused_.push_back(socket);
 }
@@ -78,6 +90,44 @@ bool WatchedSockets::tell(Watched& watched, int socket, uint32_t wanted) {
   watched.events = wanted;
   watched.refused = 0;
   return true;
+}
+
+bool WatchedSockets::restsAfter(int socket, uint32_t events) {
+  Watched& watched = at(socket);
+  if (events != EPOLLOUT || watched.pool == nullptr || (watched.events & EPOLLOUT) == 0) {
+    watched.inVain = 0;
+    wakeOne(socket, watched);
+    return false;
+  }
+  if (++watched.inVain < kMostInVain) return false;
+  watched.inVain = 0;
+  const std::optional<uint64_t> written = bytesWritten(socket);
+  if (!written || *written != watched.written) {
+    watched.written = written.value_or(0);
+    return false;
+  }
+  epoll_event event{};
+  event.events = watched.events & ~uint32_t{EPOLLOUT};
+  event.data.u64 = static_cast<uint64_t>(socket);
+  if (epoll_ctl(epoll_, EPOLL_CTL_MOD, socket, &event) != 0) return false;
+  watched.rests = true;
+  resting_.push_back(socket);
+  return true;
+}
+
+void WatchedSockets::wakeOne(int socket, Watched& watched) {
+  if (!std::exchange(watched.rests, false) || watched.events == 0) return;
+  epoll_event event{};
+  event.events = watched.events;
+  event.data.u64 = static_cast<uint64_t>(socket);
+  if (epoll_ctl(epoll_, EPOLL_CTL_MOD, socket, &event) == 0) return;
+  watched.refused = std::exchange(watched.events, 0);
+  refused_.push_back(socket);
+}
+
+void WatchedSockets::wake() {
+  for (const int socket : resting_) wakeOne(socket, at(socket));
+  resting_.clear();
 }
 
 }  // namespace kyt

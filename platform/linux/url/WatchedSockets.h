@@ -1,7 +1,10 @@
 // What the network thread's event loop knows about libcurl's sockets, by number: which pool each belongs to
 // and what the kernel watches it for. A connection that idles stays watched for input, which is what its next
-// request begins with, so that watching costs a request on a connection that exists no system call. Network
-// thread only.
+// request begins with, so that watching costs a request on a connection that exists no system call.
+//
+// Where an HTTP/2 server gives no window, or no stream, libcurl asks to be told when it can write and then writes nothing,
+// as often as it is told. Such a socket is let rest: until it can be read from, where the window comes from, or for a
+// moment. Network thread only.
 #pragma once
 
 #include <cstdint>
@@ -28,6 +31,10 @@ class WatchedSockets {
   // socket otherwise.
   [[nodiscard]] bool areSomeRefused() const { return !refused_.empty(); }
   void watchRefused();
+  // After an event of that socket has been handled. Whether it is let rest from now on.
+  [[nodiscard]] bool restsAfter(int socket, uint32_t events);
+  // All that rest.
+  void wake();
 
  private:
   struct Watched {
@@ -36,13 +43,18 @@ class WatchedSockets {
     uint32_t left = 0;                  // the turn in which it was closed, or nobody waited for it any more
     uint32_t refused = 0;               // what the kernel was asked to watch it for, and did not
     bool ours = false;
+    bool rests = false;
+    uint8_t inVain = 0;    // events that it can be written to, since `written` was looked at
+    uint64_t written = 0;  // bytes
   };
+  void wakeOne(int socket, Watched& watched);
   Watched& at(int socket);
   bool tell(Watched& watched, int socket, uint32_t wanted);
   int epoll_ = -1;
   uint32_t turn_ = 1;
   std::vector<Watched> sockets_;
   std::vector<int> refused_;
+  std::vector<int> resting_;  // and some that do no more
 };
 
 }  // namespace kyt

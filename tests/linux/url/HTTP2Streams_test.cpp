@@ -3,6 +3,7 @@
 #include <curl/curl.h>
 
 #include <cstdio>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
@@ -93,6 +94,72 @@ TEST_F(HTTP2Streams, ARequestThatCrossesAServersFarewellAndArrivesLateIsReported
   EXPECT_EQ(held.status(), 200) << held.errorText();
   EXPECT_EQ(server.times("crossing"), 1u);
   EXPECT_EQ(factory().figures().failed, 1u);
+}
+
+// That the network thread has used.
+std::chrono::nanoseconds processorTime() {
+  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+    std::ifstream called(task.path() / "comm"), used(task.path() / "schedstat");
+    std::string name;
+    int64_t nanoseconds = 0;
+    if (std::getline(called, name) && name == "kyt-network" && used >> nanoseconds)
+      return std::chrono::nanoseconds(nanoseconds);
+  }
+  return {};
+}
+
+TEST_F(HTTP2Streams, AServerThatTakesNoBodyCostsNoProcessorTimeAndGetsItWhenItDoes) {
+  TestHTTP2Server server(with());
+  auto urls = session(true);
+  ASSERT_EQ(perform(*urls, post(server.url(), "first")).status(), 200);
+  const auto setWindow = [&](uint8_t kibibytes) {
+    const char setting[] = {0, 4, 0, 0, static_cast<char>(kibibytes << 2), 0};
+    server.forEachConnection([&](Connection& connection) {
+      connection.frame(TestHTTP2Server::kSettings, 0, 0, std::string(setting, sizeof setting));
+    });
+  };
+  setWindow(0);
+  ASSERT_EQ(perform(*urls, get(server.url())).status(), 200) << "it knows of the window";
+  std::vector<Outcome> outcomes(4);
+  for (Outcome& outcome : outcomes) urls->start(post(server.url(), "body"), outcome.completion());
+  const auto before = processorTime();
+  EXPECT_FALSE(outcomes[0].wait(2s));
+  EXPECT_LT(processorTime() - before, 100ms);
+  const auto start = std::chrono::steady_clock::now();
+  setWindow(16);
+  for (Outcome& outcome : outcomes) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  }
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
+  EXPECT_EQ(server.times("body"), 4u);
+  EXPECT_EQ(server.connectionsAccepted(), 1u);
+}
+
+// It has a window for a part of it.
+TEST_F(HTTP2Streams, AServerThatTakesABodySlowlyCostsNoProcessorTime) {
+  auto options = with();
+  options.greet = [](Connection& connection) {
+    connection.allowStreams(100);
+    return false;
+  };
+  TestHTTP2Server server(options);
+  auto urls = session(true);
+  Outcome outcome;
+  urls->start(post(server.url(), std::string(70000, 'b')), outcome.completion());
+  ASSERT_TRUE(eventually([&] { return server.connectionsAccepted() == 1; }));
+  EXPECT_FALSE(outcome.wait(500ms));
+  const auto before = processorTime();
+  EXPECT_FALSE(outcome.wait(2s));
+  EXPECT_LT(processorTime() - before, 100ms);
+  server.forEachConnection([](Connection& connection) {
+    for (const uint32_t stream : {0u, 1u}) {
+      const char bytes[] = {0, 1, 0, 0};
+      connection.frame(TestHTTP2Server::kWindow, 0, stream, std::string(bytes, sizeof bytes));
+    }
+  });
+  ASSERT_TRUE(outcome.wait());
+  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
 }
 
 }  // namespace
