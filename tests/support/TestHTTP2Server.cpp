@@ -1,6 +1,5 @@
 #include "tests/support/TestHTTP2Server.h"
 
-#include <linux/filter.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <openssl/pem.h>
@@ -18,6 +17,8 @@
 #include <optional>
 #include <stdexcept>
 #include <thread>
+
+#include "tests/support/LostPackets.h"
 
 namespace kyt {
 namespace {
@@ -149,18 +150,7 @@ class TestHTTP2Server::Implementation {
     }
     void end() override { wants(End::orderly); }
     void reset() override { wants(End::reset); }
-    void loseWhatComes(bool loses) override {
-      // The kernel asks this of each packet: a TCP header has 60 bytes at most.
-      sock_filter program[] = {{BPF_LD | BPF_W | BPF_LEN, 0, 0, 0},
-                               {BPF_JMP | BPF_JGT | BPF_K, 0, 1, 60},
-                               {BPF_RET | BPF_K, 0, 0, 0},
-                               {BPF_RET | BPF_K, 0, 0, 0xffffffff}};
-      const sock_fprog filter{4, program};
-      const int none = 0;
-      const bool good = loses ? setsockopt(socket_, SOL_SOCKET, SO_ATTACH_FILTER, &filter, sizeof filter) == 0
-                              : setsockopt(socket_, SOL_SOCKET, SO_DETACH_FILTER, &none, sizeof none) == 0;
-      if (!good) throw std::runtime_error("TestHTTP2Server: no filter");
-    }
+    void loseWhatComes(bool loses) override { losePackets(socket_, loses); }
 
    private:
     enum class End { none, orderly, reset, stop };

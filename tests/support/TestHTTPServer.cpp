@@ -18,6 +18,7 @@
 #include <stdexcept>
 #include <thread>
 
+#include "tests/support/LostPackets.h"
 #include "tests/support/NetworkNamespace.h"
 
 namespace kyt {
@@ -218,6 +219,11 @@ class TestHTTPServer::Implementation {
     for (Connection& connection : connections_) close(connection.socket);
   }
 
+  void loseWhatComes() {
+    std::lock_guard lock(mutex_);
+    for (const Connection& connection : connections_) losePackets(connection.socket, true);
+  }
+
   void closeConnections() {
     std::lock_guard lock(mutex_);
     for (Connection& connection : connections_) shutdown(connection.socket, SHUT_RDWR);
@@ -411,6 +417,9 @@ void TestHTTPServer::release() {
   implementation_->changed_.notify_all();
 }
 
+void TestHTTPServer::loseWhatComes() {
+  implementation_->loseWhatComes();
+}
 void TestHTTPServer::closeConnections() {
   implementation_->closeConnections();
 }

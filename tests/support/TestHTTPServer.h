@@ -93,6 +93,7 @@ class TestHTTPServer {
                                             std::chrono::milliseconds timeout = kTestDeadline) const;
 
   void release();           // lets every held request be answered, now and later
+  void loseWhatComes();     // on the connections there are: see LostPackets.h
   void closeConnections();  // cuts all connections; goes on listening
   void stop();
 

@@ -114,14 +114,15 @@ void URLNetwork::failWith(URLTransfer& transfer, CURLcode code) {
   }
 }
 
+// The server may have other addresses than the connection's, so whether there is a way is seen by going.
 bool URLNetwork::goAgainOrWait(URLTransfer& transfer) {
-  if (transfer.session->configuration.waitsForConnectivity && !canLeave(transfer)) {
-    setAside(transfer);
+  if (transfer.immediateRetries < kMostRepeats) {
+    ++transfer.immediateRetries;
+    activate(transfer);
     return true;
   }
-  if (transfer.immediateRetries >= kMostRepeats) return false;
-  ++transfer.immediateRetries;
-  activate(transfer);
+  if (!transfer.session->configuration.waitsForConnectivity || canLeave(transfer)) return false;
+  setAside(transfer);
   return true;
 }
 

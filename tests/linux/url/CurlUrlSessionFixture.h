@@ -5,8 +5,11 @@
 #include <gtest/gtest.h>
 
 #include <condition_variable>
+#include <cstdio>
+#include <fstream>
 #include <mutex>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <thread>
 
@@ -106,6 +109,21 @@ class CurlURLSessionFixture : public testing::Test {
     session.start(std::move(request), outcome.completion());
     EXPECT_TRUE(outcome.wait());
     return outcome;
+  }
+
+  // Whether something that was sent is not acknowledged, on the connections to that port, by the kernel's table.
+  static bool hasUnacknowledged(uint16_t port) {
+    char peersPort[8];
+    std::snprintf(peersPort, sizeof peersPort, ":%04X", port);
+    for (const char* table : {"/proc/thread-self/net/tcp", "/proc/thread-self/net/tcp6"}) {
+      std::ifstream file(table);
+      std::string number, local, peer, is, queues;
+      for (std::string line; std::getline(file, line);) {
+        std::istringstream(line) >> number >> local >> peer >> is >> queues;
+        if (peer.ends_with(peersPort) && !queues.starts_with("00000000")) return true;
+      }
+    }
+    return false;
   }
 
   MemoryLogSink sink_;

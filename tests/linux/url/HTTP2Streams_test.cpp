@@ -2,10 +2,8 @@
 // nothing that it may have got is sent a second time, and what happens to one request costs no other its answer.
 #include <curl/curl.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 #include "tests/support/TestHTTP2Server.h"
@@ -24,18 +22,6 @@ class HTTP2Streams : public CurlURLSessionFixture {
     TestHTTP2Server::Options options;
     options.certificate = authority_.issue();
     return options;
-  }
-  // Of the connections to that port, by the kernel's table.
-  static bool hasUnacknowledged(uint16_t port) {
-    char peersPort[8];
-    std::snprintf(peersPort, sizeof peersPort, ":%04X", port);
-    std::ifstream file("/proc/thread-self/net/tcp");
-    std::string number, local, peer, is, queues;
-    for (std::string line; std::getline(file, line);) {
-      std::istringstream(line) >> number >> local >> peer >> is >> queues;
-      if (peer.ends_with(peersPort) && !queues.starts_with("00000000")) return true;
-    }
-    return false;
   }
   TestCertificateAuthority authority_;
 };

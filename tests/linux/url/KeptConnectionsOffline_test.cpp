@@ -310,6 +310,26 @@ TEST_P(KeptConnectionsOffline, WhatHadNoConnectionYetDoesNotWaitForThoseOfAForme
   EXPECT_EQ(times("next"), 2u);
 }
 
+TEST_P(KeptConnectionsOffline,
+       APostOfWhichAPartHasArrivedWhenTheAddressChangesIsReportedAndTheNextIsNotDelayed) {
+  options_.noProgressTimeout = 3s;
+  auto urls = session(true);
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  Outcome cut;
+  const std::string large(200u << 20, 'l');  // more than is sent before the address changes
+  urls->start(post(server_->url("/"), large), cut.completion());
+  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  ASSERT_TRUE(move());
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(perform(*urls, post(server_->url("/"), "after")).status(), 200);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
+  ASSERT_TRUE(cut.wait());
+  EXPECT_NE(cut.errorCode(), 0);
+  EXPECT_EQ(server_->requestCount(), 2u);
+  EXPECT_EQ(server_->connectionsAccepted(), 2u) << "none for another attempt";
+  EXPECT_EQ(factory().figures().failed, 1u);
+}
+
 // The kernel's events cannot be had: too many descriptors are open, say.
 class KeptConnectionsUntold : public KeptConnectionsOffline {
  protected:
