@@ -46,11 +46,48 @@ if(KYT_COVERAGE)
   target_link_options(kyt_options INTERFACE --coverage)
 endif()
 
-# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library.
+# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library. Its objects can be linked with and without
+# optimisation at link time.
 function(kyt_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;LINKS;PRIVATE_LINKS" ${ARGN})
   add_library(${name} STATIC ${ARG_SOURCES})
   target_link_libraries(${name} PUBLIC kyt_options ${ARG_LINKS} PRIVATE ${ARG_PRIVATE_LINKS})
+  if(CMAKE_INTERPROCEDURAL_OPTIMIZATION AND CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    target_compile_options(${name} PRIVATE -ffat-lto-objects)
+  endif()
+endfunction()
+
+# kyt_plain_link(NAME): the program is linked without optimisation at link time, which makes machine code of all
+# libraries once more: too much for programs of which nobody measures the speed.
+function(kyt_plain_link name)
+  set_target_properties(${name} PROPERTIES INTERPROCEDURAL_OPTIMIZATION OFF)
+  if(CMAKE_INTERPROCEDURAL_OPTIMIZATION AND CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    target_link_options(${name} PRIVATE -fno-lto)
+  endif()
+endfunction()
+
+# What tests are compiled with: without optimisation, for nothing measures them, and with the headers of the test
+# framework and of the standard library compiled once. No header of this project is among those.
+function(kyt_test_options name)
+  target_compile_options(${name} PRIVATE -O0 -U_FORTIFY_SOURCE)
+  kyt_plain_link(${name})
+  if(NOT KYT_PRECOMPILED_HEADERS)
+    return()
+  endif()
+  if(NOT TARGET kyt_tests_headers)
+    file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/kyt_tests_headers.cpp CONTENT "")
+    add_library(kyt_tests_headers OBJECT ${CMAKE_BINARY_DIR}/kyt_tests_headers.cpp)
+    target_link_libraries(kyt_tests_headers PRIVATE kyt_options GTest::gtest)
+    target_compile_options(kyt_tests_headers PRIVATE -O0 -U_FORTIFY_SOURCE -fPIE)  # as programs are compiled
+    if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")  # the compiler cache finds again what holds no time
+      target_compile_options(kyt_tests_headers PRIVATE "SHELL:-Xclang -fno-pch-timestamp")
+    endif()
+    kyt_plain_link(kyt_tests_headers)
+    target_precompile_headers(kyt_tests_headers PRIVATE <gtest/gtest.h> <algorithm> <array> <atomic> <chrono>
+      <condition_variable> <filesystem> <fstream> <functional> <future> <map> <memory> <mutex> <optional> <set> <sstream>
+      <string> <string_view> <thread> <unordered_map> <utility> <variant> <vector>)
+  endif()
+  target_precompile_headers(${name} REUSE_FROM kyt_tests_headers)
 endfunction()
 
 # kyt_test(NAME SOURCES ... LINKS ... [TIMEOUT SECONDS]): one test program; its tests appear one by one in ctest.
@@ -60,7 +97,8 @@ function(kyt_test name)
     set(ARG_TIMEOUT 60)
   endif()
   add_executable(${name} ${ARG_SOURCES})
-  target_link_libraries(${name} PRIVATE kyt_options ${ARG_LINKS} GTest::gmock GTest::gtest_main)
+  target_link_libraries(${name} PRIVATE kyt_options ${ARG_LINKS} GTest::gtest_main)
+  kyt_test_options(${name})
   set_property(GLOBAL APPEND PROPERTY KYT_TEST_SOURCES ${ARG_SOURCES})
   set(properties TIMEOUT ${ARG_TIMEOUT})
   if(ARG_LABELS)
