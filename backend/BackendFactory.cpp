@@ -1,11 +1,11 @@
 #include "backend/BackendFactory.h"
 
 #include "config/DeviceIdentity.h"
+#include "platform/Bundle.h"
 #include "platform/Clock.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/System.h"
 
 namespace kyt {
 

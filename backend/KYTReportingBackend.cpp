@@ -7,8 +7,9 @@
 #include "platform/Counters.h"
 #include "platform/Cryptography.h"
 #include "platform/Platform.h"
+#include "platform/RandomSource.h"
 #include "platform/SerialQueue.h"
-#include "platform/System.h"
+#include "platform/UUIDText.h"
 #include "platform/UserBudget.h"
 #include "platform/UserDefaults.h"
 

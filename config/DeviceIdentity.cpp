@@ -3,7 +3,8 @@
 #include <cstring>
 
 #include "platform/DeviceProperties.h"
-#include "platform/System.h"
+#include "platform/RandomSource.h"
+#include "platform/UUIDText.h"
 
 namespace kyt {
 

@@ -8,12 +8,14 @@
 
 #include "config/ClientTypes.h"
 #include "config/Environment.h"
-#include "platform/DataServices.h"
+#include "platform/Base64.h"
+#include "platform/Bundle.h"
+#include "platform/Description.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/PropertyLists.h"
 #include "platform/Semaphore.h"
-#include "platform/System.h"
 
 namespace kyt {
 

@@ -1,5 +1,6 @@
 #include "daemon/HealthReport.h"
 
+#include "platform/Description.h"
 #include "platform/Log.h"
 
 namespace kyt {

@@ -8,7 +8,7 @@
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/System.h"
+#include "platform/ProcessTransaction.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

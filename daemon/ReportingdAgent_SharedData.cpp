@@ -5,9 +5,9 @@
 #include "platform/Counters.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
+#include "platform/MemoryInfo.h"
 #include "platform/ObjectSize.h"
 #include "platform/Platform.h"
-#include "platform/System.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

@@ -6,7 +6,7 @@
 #include <cmath>
 #include <cstdio>
 
-#include "platform/Log.h"
+#include "platform/Description.h"
 #include "platform/Value.h"
 
 namespace kyt {

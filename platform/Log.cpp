@@ -1,4 +1,5 @@
 #include "platform/Log.h"
+#include "platform/Description.h"
 
 #include <algorithm>
 #include <cstdio>

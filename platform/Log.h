@@ -58,7 +58,7 @@ class Log {
   void normal(const char* format, ...) __attribute__((format(printf, 2, 3)));  // the level "default"
   void error(const char* format, ...) __attribute__((format(printf, 2, 3)));
 
-  // For the formats that show an object as "%@", which the compiler cannot check: see formatObjects.
+  // For the formats that show an object as "%@", which the compiler cannot check: see Description.h.
   void debugObjects(const char* format, std::initializer_list<Value> objects);
 
  private:
@@ -70,9 +70,5 @@ class Log {
   std::atomic<LineLimits*> lineLimits_{nullptr};
   std::atomic<int> level_;
 };
-
-// Fills a "%@" template: every conversion, "%@", "%s", "%u" or another (its flags and width are ignored),
-// takes the next object's description; a missing object prints as "(null)"; "%%" is a percent sign.
-[[nodiscard]] std::string formatObjects(const char* format, std::initializer_list<Value> objects);
 
 }  // namespace kyt

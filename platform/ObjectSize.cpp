@@ -1,6 +1,6 @@
 #include "platform/ObjectSize.h"
 
-#include "platform/System.h"
+#include "platform/MemoryInfo.h"
 
 namespace kyt {
 namespace {

@@ -7,6 +7,7 @@
 
 #include "platform/Clock.h"
 #include "platform/Counters.h"
+#include "platform/Description.h"
 #include "platform/FileManager.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"

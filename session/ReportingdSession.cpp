@@ -4,14 +4,17 @@
 #include <cassert>
 #include <utility>
 
+#include "platform/Base64.h"
+#include "platform/Bundle.h"
 #include "platform/Counters.h"
+#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Keys.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/ObjectSize.h"
 #include "platform/Platform.h"
-#include "platform/System.h"
+#include "platform/RandomSource.h"
 #include "platform/UserDefaults.h"
 #include "session/ReportingSessionConnectivityHelper.h"
 #include "session/SessionInfoCheck.h"

@@ -8,9 +8,10 @@
 
 #include <memory>
 
+#include "platform/Base64.h"
 #include "platform/Cryptography.h"
-#include "platform/DataServices.h"
-#include "platform/System.h"
+#include "platform/JSON.h"
+#include "platform/PropertyLists.h"
 #include "tools/TomlValues.h"
 
 namespace kyt::tools {

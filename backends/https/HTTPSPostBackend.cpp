@@ -1,6 +1,7 @@
 #include "backends/https/HTTPSPostBackend.h"
 
 #include "platform/Counters.h"
+#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"

@@ -8,6 +8,7 @@
 #include "backends/https/HTTPSPostBackend.h"
 #include "config/ClientTypes.h"
 #include "config/DeviceIdentity.h"
+#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
 #include "platform/Platform.h"

@@ -5,6 +5,7 @@
 #include "backends/https/HTTPSPostBackend.h"
 #include "config/Environment.h"
 #include "platform/Counters.h"
+#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Keys.h"
 #include "platform/Log.h"

@@ -11,6 +11,7 @@
 #include "backend/PayloadCompression.h"
 #include "platform/Clock.h"
 #include "platform/Counters.h"
+#include "platform/Description.h"
 #include "platform/FileExtension.h"
 #include "platform/Limits.h"
 #include "platform/Log.h"

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/System.h"
+#include "platform/Bundle.h"
 
 namespace kyt {
 

@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/System.h"
+#include "platform/Confinement.h"
 
 namespace kyt {
 

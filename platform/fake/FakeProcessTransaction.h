@@ -3,7 +3,7 @@
 
 #include <atomic>
 
-#include "platform/System.h"
+#include "platform/ProcessTransaction.h"
 
 namespace kyt {
 

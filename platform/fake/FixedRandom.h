@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "platform/Mutex.h"
-#include "platform/System.h"
+#include "platform/RandomSource.h"
 
 namespace kyt {
 

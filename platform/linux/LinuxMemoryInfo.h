@@ -1,7 +1,7 @@
 // What the allocator and the kernel say about this process's memory.
 #pragma once
 
-#include "platform/System.h"
+#include "platform/MemoryInfo.h"
 
 namespace kyt {
 

@@ -1,7 +1,7 @@
 // Randomness of the kernel.
 #pragma once
 
-#include "platform/System.h"
+#include "platform/RandomSource.h"
 
 namespace kyt {
 

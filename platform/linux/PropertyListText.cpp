@@ -4,7 +4,7 @@
 #include <cmath>
 #include <cstdio>
 
-#include "platform/System.h"
+#include "platform/Base64.h"
 #include "platform/linux/PugixmlPropertyLists.h"
 
 namespace kyt {

@@ -6,8 +6,8 @@
 #include <optional>
 #include <pugixml.hpp>
 
+#include "platform/Base64.h"
 #include "platform/Limits.h"
-#include "platform/System.h"
 #include "platform/TextEscape.h"
 
 namespace kyt {

@@ -5,7 +5,7 @@
 // belongs, are errors.
 #pragma once
 
-#include "platform/DataServices.h"
+#include "platform/PropertyLists.h"
 
 namespace kyt {
 

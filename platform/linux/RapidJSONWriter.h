@@ -2,7 +2,7 @@
 // between, and writing a record allocates nothing but the text itself.
 #pragma once
 
-#include "platform/DataServices.h"
+#include "platform/JSON.h"
 
 namespace kyt {
 

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/Semaphore.h"
+#include "platform/UUIDText.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 

@@ -2,7 +2,7 @@
 
 #include <cmath>
 
-#include "platform/Log.h"
+#include "platform/Description.h"
 #include "platform/Value.h"
 
 namespace kyt {

@@ -4,7 +4,7 @@
 
 #include <map>
 
-#include "platform/System.h"
+#include "platform/MemoryInfo.h"
 
 namespace kyt {
 namespace {

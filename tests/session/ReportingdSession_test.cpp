@@ -1,7 +1,7 @@
 // The life and configuration of a session.
 #include "session/ReportingdSession.h"
 
-#include "platform/System.h"
+#include "platform/Base64.h"
 #include "platform/UserDefaults.h"
 #include "tests/session/SessionFixture.h"
 

@@ -4,6 +4,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/Description.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "session/MessageLog.h"

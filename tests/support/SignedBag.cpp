@@ -8,7 +8,7 @@
 #include <memory>
 #include <vector>
 
-#include "platform/System.h"
+#include "platform/Base64.h"
 
 namespace kyt {
 

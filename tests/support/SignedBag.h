@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "platform/DataServices.h"
+#include "platform/PropertyLists.h"
 #include "platform/Value.h"
 
 namespace kyt {

@@ -7,7 +7,7 @@
 #include <variant>
 
 #include "platform/Clock.h"
-#include "platform/DataServices.h"
+#include "platform/JSON.h"
 #include "platform/Value.h"
 
 namespace kyt::tools {

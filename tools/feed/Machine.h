@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "backends/dashboard/DashboardBackend.h"
+#include "platform/Bundle.h"
 #include "platform/Counters.h"
 #include "platform/Limits.h"
 #include "platform/Platform.h"

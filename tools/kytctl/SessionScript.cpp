@@ -7,7 +7,6 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/DataServices.h"
 #include "platform/TextEscape.h"
 
 namespace kyt::tools {

@@ -13,7 +13,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/System.h"
+#include "platform/Confinement.h"
 #include "platform/linux/system/ConfinementProfile.h"
 
 namespace kyt {

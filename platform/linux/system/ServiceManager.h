@@ -10,7 +10,7 @@
 
 #include "platform/Clock.h"
 #include "platform/Mutex.h"
-#include "platform/System.h"
+#include "platform/ProcessTransaction.h"
 #include "platform/Timer.h"
 
 namespace kyt {

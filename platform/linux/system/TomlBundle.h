@@ -9,9 +9,9 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Bundle.h"
 #include "platform/Log.h"
 #include "platform/Mutex.h"
-#include "platform/System.h"
 #include "platform/linux/system/Files.h"
 
 namespace kyt {

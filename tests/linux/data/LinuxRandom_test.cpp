@@ -7,6 +7,7 @@
 #include <set>
 #include <string>
 
+#include "platform/UUIDText.h"
 #include "platform/fake/FixedRandom.h"
 
 namespace kyt {

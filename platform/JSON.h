@@ -1,5 +1,5 @@
-// Property lists and JSON to and from objects. Any thread, no state, never blocks. Input is hostile: depth is limited
-// to `Limits::maxObjectDepth`, no external entity is ever resolved, UTF-8 is checked.
+// JSON to and from objects. Any thread, no state, never blocks. Input is hostile: depth is limited to
+// `Limits::maxObjectDepth`, UTF-8 is checked.
 #pragma once
 
 #include <string>
@@ -10,15 +10,6 @@
 #include "platform/Value.h"
 
 namespace kyt {
-
-class PropertyLists {
- public:
-  virtual ~PropertyLists() = default;
-  // The root object of an XML property list, or an error whose description says what is wrong and where.
-  [[nodiscard]] virtual std::variant<Value, Error> parse(std::string_view bytes) = 0;
-  // XML; objects that a property list cannot carry (null) are left out.
-  [[nodiscard]] virtual std::string serialize(const Value& value) = 0;
-};
 
 class JSON {
  public:

@@ -1,4 +1,4 @@
-#include "platform/System.h"
+#include "platform/Base64.h"
 
 #include <gtest/gtest.h>
 
@@ -13,12 +13,6 @@ std::optional<std::string> decoded(std::string_view text) {
   const auto data = base64Decode(text);
   if (!data) return std::nullopt;
   return std::string(data->view());
-}
-
-TEST(UUIDText, IsUpperCaseWithItsGroups) {
-  std::array<std::byte, 16> bytes{};
-  for (size_t i = 0; i < 16; ++i) bytes[i] = static_cast<std::byte>(0xF0 - i);
-  EXPECT_EQ(uuidText(bytes), "F0EFEEED-ECEB-EAE9-E8E7-E6E5E4E3E2E1");
 }
 
 TEST(Base64, EncodesWithPadding) {
