@@ -351,6 +351,45 @@ TEST_P(ConfinementStep, ThatFailsEndsTheStartWith255AndALine) {
   EXPECT_GT(failed, 0);
 }
 
+// What the kernel lists of the process: the filters that it runs under.
+std::string filtersOf(const FailingDaemon& daemon) {
+  std::ifstream status("/proc/" + std::to_string(daemon.process()) + "/status");
+  std::string filters;
+  for (std::string line; std::getline(status, line);)
+    if (line.starts_with("Seccomp") || line.starts_with("NoNewPrivs")) filters += line + "\n";
+  return filters;
+}
+
+// Some of these calls only ask what the kernel knows, and there are other ways to enter a filter.
+using FailedCallsForAFilter = FailedCallsFixture;
+
+TEST_F(FailedCallsForAFilter, NeverLeaveTheDaemonWithLess) {
+  std::string whole;
+  {
+    FailingDaemon daemon(server_.url(""));
+    ASSERT_TRUE(startsOrEnds(daemon) && !daemon.hasEnded()) << daemon.log();
+    whole = filtersOf(daemon);
+    ASSERT_NE(whole.find("Seccomp_filters:\t"), std::string::npos) << whole;
+    endsInOrder(daemon);
+  }
+  for (int first = 1, failures = 1; failures > 0; ++first) {
+    SCOPED_TRACE(first);
+    FailingDaemon daemon(server_.url(""));
+    daemon.fail(kyt_failing_seccomp, EINVAL, first);
+    ASSERT_TRUE(startsOrEnds(daemon)) << daemon.log();
+    failures = daemon.failures();
+    daemon.stopFailing();
+    if (daemon.hasEnded()) {
+      EXPECT_EQ(daemon.exitStatus(), 255) << daemon.log();
+      EXPECT_TRUE(daemon.logged("<3>main: confine_init() fails: seccomp: ")) << daemon.log();
+    } else {
+      EXPECT_EQ(filtersOf(daemon), whole);
+      endsInOrder(daemon);
+    }
+    if (HasFailure()) return;
+  }
+}
+
 const Failure kSteps[] = {
     KYT_FAILURE(prctl, EPERM),
     KYT_FAILURE(capset, EPERM),
@@ -358,6 +397,7 @@ const Failure kSteps[] = {
     KYT_FAILURE(landlock_add_rule, ENOMEM),
     KYT_FAILURE(landlock_restrict_self, E2BIG),
     KYT_FAILURE(setrlimit, EPERM),
+    KYT_FAILURE(seccomp_load, ENOMEM),
 };
 
 INSTANTIATE_TEST_SUITE_P(Of, ConfinementStep, ::testing::ValuesIn(kSteps),

@@ -9,6 +9,7 @@
 #include <dlfcn.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <linux/seccomp.h>
 #include <poll.h>
 #include <pthread.h>
 #include <stdarg.h>
@@ -184,5 +185,7 @@ long syscall(long number, ...) {
   if (number == SYS_##name && fails(kyt_failing_##name)) return -1;
   KYT_FAILING_NUMBERS(KYT_NUMBER)
 #undef KYT_NUMBER
+  const int enters = number == SYS_seccomp && arguments[0] == SECCOMP_SET_MODE_FILTER && arguments[2] != 0;
+  if (enters && fails(kyt_failing_seccomp_load)) return -1;
   return real(number, arguments[0], arguments[1], arguments[2], arguments[3], arguments[4], arguments[5]);
 }

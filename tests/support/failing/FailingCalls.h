@@ -14,10 +14,12 @@
 #define KYT_FAILING_NUMBERS(X) \
   X(landlock_create_ruleset) X(landlock_add_rule) X(landlock_restrict_self) X(seccomp) X(capget) X(capset) \
   X(pidfd_open)
+/* One use of a call: that which enters a filter of system calls, and none that asks what the kernel knows of filters. */
+#define KYT_FAILING_USES(X) X(seccomp_load)
 
 enum kyt_failing_call {
 #define KYT_NAME(name) kyt_failing_##name,
-  KYT_FAILING_FUNCTIONS(KYT_NAME) KYT_FAILING_NUMBERS(KYT_NAME)
+  KYT_FAILING_FUNCTIONS(KYT_NAME) KYT_FAILING_NUMBERS(KYT_NAME) KYT_FAILING_USES(KYT_NAME)
 #undef KYT_NAME
   kyt_failing_calls
 };
