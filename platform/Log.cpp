@@ -73,11 +73,10 @@ void Log::write(LogLevel level, const char* format, va_list arguments) {
   va_end(again);
 }
 
+// Sinks escape what they write, and what is escaped may be four times as long: that is what counts.
 void Log::writeLine(LogLevel level, std::string line, size_t whole) {
-  if (whole > Limits::maxLogLineBytes) {
-    size_t end = Limits::maxLogLineBytes;
-    // Not within a character.
-    for (int back = 0; back < 3 && (static_cast<unsigned char>(line[end]) & 0xC0) == 0x80; ++back) --end;
+  const size_t end = lengthThatFits(line, Limits::maxLogLineBytes);
+  if (end < whole) {
     line.resize(end);
     line.append(" (cut, ").append(std::to_string(whole)).append(" bytes in all)");
   }

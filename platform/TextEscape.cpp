@@ -103,6 +103,24 @@ std::string escapedText(std::string_view text) {
   return out;
 }
 
+size_t lengthThatFits(std::string_view text, size_t escapedBytes) {
+  size_t end = 0;
+  for (size_t used = 0; end < text.size();) {
+    const std::string_view rest = text.substr(end);
+    const size_t length = std::max<size_t>(utf8SequenceLength(rest), 1);
+    if (isPlainASCII(rest.front())) {
+      ++used;
+    } else {
+      std::string shown;
+      appendEscaped(shown, rest.substr(0, length));
+      used += shown.size();
+    }
+    if (used > escapedBytes) break;
+    end += length;
+  }
+  return end;
+}
+
 bool isPlainText(std::string_view text) {
   if (std::all_of(text.begin(), text.end(), isPlainASCII)) return true;
   return escapedText(text).size() == text.size();

@@ -15,6 +15,8 @@ namespace kyt {
 
 void appendEscaped(std::string& out, std::string_view text);
 [[nodiscard]] std::string escapedText(std::string_view text);
+// How much of the text, whole characters, becomes at most so many bytes when it is escaped.
+[[nodiscard]] size_t lengthThatFits(std::string_view text, size_t escapedBytes);
 // Whether escapedText() would change nothing.
 [[nodiscard]] bool isPlainText(std::string_view text);
 // The length of the valid UTF-8 sequence that `text` begins with, 0 when there is none.

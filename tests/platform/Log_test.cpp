@@ -71,6 +71,19 @@ TEST(Log, CutsBetweenCharacters) {
   EXPECT_EQ(sink.lines()[0].line, before + " (cut, 16395 bytes in all)");
 }
 
+TEST(Log, CutsByWhatItsSinksMakeOfALine) {
+  MemoryLogSink sink;
+  Log log(sink, LogLevel::debug);
+  const std::string breaks(10000, '\n');  // shown as two characters each
+  log.normal("%s", breaks.c_str());
+  log.debugObjects("%@", {String(std::string(5000, '\x01'))});  // four each
+  ASSERT_EQ(sink.lines().size(), 2U);
+  EXPECT_EQ(sink.lines()[0].line,
+            breaks.substr(0, Limits::maxLogLineBytes / 2) + " (cut, 10000 bytes in all)");
+  EXPECT_EQ(sink.lines()[1].line,
+            std::string(Limits::maxLogLineBytes / 4, '\x01') + " (cut, 5000 bytes in all)");
+}
+
 TEST(Log, PrintsAMissingTextAsNull) {
   MemoryLogSink sink;
   Log log(sink);
