@@ -82,6 +82,26 @@ std::string manyIntrospections(size_t bytes) {
   return calls;
 }
 
+// What a client says about itself, most of it a text of that length.
+std::string callWithText(size_t bytes, uint32_t serial) {
+  std::string call;
+  MessageWriter writer(call);
+  writer.beginCall(serial, {.path = "/com/vantu/kytreportingd",
+                            .member = "SetSessionInfo",
+                            .signature = "a{sv}aa{sv}avb",
+                            .expectsReply = false});
+  writer.writeDictionary(Dictionary{
+      {kKYTReportingSessionInfoSessionID, 77},
+      {kKYTReportingSessionInfoClientType, 20},
+      {kKYTReportingSessionInfoHierarchyToken,
+       Dictionary{{kKYTReportingHierarchyTokenTokenID, "shared"}, {kKYTReportingHierarchyTokenLevel, 1}}}});
+  writer.writeOptionalDictionary(Dictionary{{"ClientName", "x"}, {"text", std::string(bytes, 'x')}});
+  writer.writeOptionalValue(nullptr);
+  writer.writeBoolean(false);
+  static_cast<void>(writer.end());
+  return call;
+}
+
 // Reads nothing, and stops sending when the daemon stops reading.
 void sendWhatIsTaken(const PlainClient& client, std::string_view bytes) {
   while (!bytes.empty()) {
@@ -262,6 +282,74 @@ TEST_F(AttackedDaemon, KeepsItsMemoryFromEventsThatNobodyTakes) {
   EXPECT_TRUE(kSanitized || most < 32 * 1024) << most;
   EXPECT_TRUE(logged("HTTPSPostBackend(batchEvent): user 65534 holds ")) << daemonLog();
   expectBearable(before, during);
+  for (const Process& client : hostile) client->kill();
+  expectNothingLost();
+}
+
+// The shares of a device with 512 MiB, where the service may have 128 MiB (UserShares_test has the numbers). All at once:
+// replies that nobody reads, descriptors, the beginnings of messages, what sessions say about themselves, tokens and what
+// is shared, and batches.
+TEST_F(AttackedDaemon, OfASmallDeviceStaysBelowWhatItsServiceMayHave) {
+  start(
+      "[limits]\nmax_bytes_per_user = 16777216\nmax_uploading_bytes_per_user = 16777216\n"
+      "max_descriptors_per_user = 32768\n");
+  if (IsSkipped()) return;
+  std::filesystem::copy(stage_->program("kytctl"), stage_->folder() + "/kytctl");
+  const Attacker replies(socket(), [](const std::string& path) {
+    const std::string calls = manyIntrospections(140000);
+    Connections kept;
+    for (int i = 0; i < 100; ++i) {
+      auto client = std::make_unique<PlainClient>(path);
+      if (client->connected() && client->shakeHands()) sendWhatIsTaken(*client, calls);
+      kept.push_back(std::move(client));
+    }
+  });
+  const Attacker halves(socket(), [](const std::string& path) {
+    const std::string half = callWithText(1000000, 1).substr(0, 900000);
+    Connections kept;
+    for (int i = 0; i < 100; ++i) {
+      auto client = std::make_unique<PlainClient>(path);
+      if (client->connected() && client->shakeHands()) {
+        client->send(half.substr(0, 1000), std::vector<int>(16, 0));
+        sendWhatIsTaken(*client, std::string_view(half).substr(1000));
+      }
+      kept.push_back(std::move(client));
+    }
+  });
+  const Attacker sessions(socket(), [](const std::string& path) {
+    Connections kept;
+    for (int i = 0; i < 100; ++i) {
+      auto client = std::make_unique<PlainClient>(path);
+      if (client->connected() && client->shakeHands())
+        for (uint32_t serial = 1; serial < 20; ++serial)
+          sendWhatIsTaken(*client, callWithText(900000, serial));
+      kept.push_back(std::move(client));
+    }
+  });
+  std::vector<Process> hostile;
+  for (int i = 0; i < 5; ++i) {
+    hostile.push_back(std::make_unique<ScriptedClient>(
+        stage_->folder() + "/kytctl", std::vector<std::string>{"--socket", socket()}, kNobody));
+    hostile.back()->step(opening("hostile", i, 100 + i, false, 20, "token" + std::to_string(i)));
+    hostile.back()->step(R"({"do":"configure"})");
+  }
+  long most = 0;
+  const auto look = [&] { most = std::max(most, anonymousKiB()); };
+  for (int round = 0; round < 20; ++round) {
+    for (const Process& client : hostile)
+      client->step("{\"do\":\"send\",\"category\":9,\"type\":1,\"repeat\":200,\"payload\":{\"t\":\"" +
+                   std::string(4000, 'x') + "\"}}");
+    look();
+    static_cast<void>(eventsOfOnePhase("attacked"));
+    look();
+  }
+  for (const Attacker* attacker : {&replies, &halves, &sessions})
+    for (int round = 0; round < 600 && !attacker->isDone(std::chrono::milliseconds(100)); ++round) look();
+  look();
+  std::printf("the daemon: %ld KiB at most\n", most);
+  // The kernel's part, mostly buffers of sockets, counts too: what the shares say of it is as much as this again.
+  EXPECT_TRUE(kSanitized || most < 64 * 1024) << most;
+  EXPECT_TRUE(logged("its user's clients hold too many bytes")) << daemonLog();
   for (const Process& client : hostile) client->kill();
   expectNothingLost();
 }
