@@ -16,11 +16,12 @@ constexpr Duration kPollPeriod =
     std::chrono::milliseconds(5);  // of what has no event of its own, at the end only
 constexpr Duration kCancelGrace = std::chrono::seconds(1);  // for what was cancelled to call its completions
 
-WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log) {
+WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log, const UserBudget& budget) {
   WorkerPoolOptions options;
   options.counters = &counters;
   options.log = &log;
   options.maxWorkers = Limits::maxWorkers;
+  options.mostOfOneOwner = budget.most(Share::workers);
   options.nameThread = beginServiceThread;
   options.whenQuiet = giveFreeMemoryBack;
   return options;
@@ -33,10 +34,10 @@ CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
   return options;
 }
 
-TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const Limits& limits) {
+TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const UserBudget& budget) {
   TomlUserDefaultsOptions options;
   options.folder = paths.userDefaults();
-  options.mostIdentifiersOfAUser = limits.maxCustomIdentifiersPerUser;
+  options.mostIdentifiersOfAUser = budget.most(Share::identifiers);
   return options;
 }
 
@@ -102,8 +103,8 @@ DaemonServices::DaemonServices(Start start)
       idle_(std::move(start.idle)),
       budget_(UserShares::of(settings_.limits, start.memory, start.descriptors)),
       reactor_(std::move(start.reactor)),
-      workers_(workerPoolOptions(counters_, log_)),
-      userDefaults_(userDefaultsOptions(start.paths, settings_.limits), log_, counters_, clock_),
+      workers_(workerPoolOptions(counters_, log_, budget_)),
+      userDefaults_(userDefaultsOptions(start.paths, budget_), log_, counters_, clock_),
       deviceProperties_(deviceSources(start.paths), cryptography_, log_, clock_),
       consent_(userDefaults_),
       clientBundle_(start.paths.clientBundle(), log_),
@@ -123,11 +124,12 @@ DaemonServices::DaemonServices(Start start)
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
       configuration_{platform_, deviceIdentity_, environment_},
       backendFactory_(configuration_, backendTable(configuration_)),
-      messageLog_(start.paths.messageLogs(), fileManager_, clock_, log_, counters_),
+      messageLog_(start.paths.messageLogs(), fileManager_, clock_, log_, counters_,
+                  budget_.most(Share::messageLogBytes)),
       fetcher_(configuration_, backendClassLock_),
       sessionClass_(configuration_, backendFactory_, messageLog_),
       queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),
-      lineLimits_(log_, clock_, *reactor_, queue_),
+      lineLimits_(log_, clock_, *reactor_, queue_, budget_.most(Share::logLines)),
       transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *reactor_, queue_,
                    [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),

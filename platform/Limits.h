@@ -52,6 +52,7 @@ struct Limits {
   static constexpr size_t maxActiveRequests = 1024;
   static constexpr size_t maxActiveRequestsToOneServer = 512;  // one without answers leaves others room
   static constexpr size_t maxWorkers = 512;                    // threads
+  static constexpr size_t maxWorkersPerUser = maxWorkers / 2;  // blocked ones of one user leave others some
   static constexpr size_t maxHandshakeBytes = 16384;           // before authentication
   static constexpr double handshakeSeconds = 30;
   static constexpr double messageSeconds = 30;  // once begun; it keeps memory and descriptors until its end

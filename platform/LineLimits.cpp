@@ -26,8 +26,9 @@ std::optional<uint32_t> ClientScope::user() {
   return currentUser;
 }
 
-LineLimits::LineLimits(Log& log, Clock& clock, TimerService& timers, std::shared_ptr<SerialQueue> queue)
-    : log_(log), clock_(clock), timers_(timers), queue_(std::move(queue)) {
+LineLimits::LineLimits(Log& log, Clock& clock, TimerService& timers, std::shared_ptr<SerialQueue> queue,
+                       uint64_t most)
+    : log_(log), clock_(clock), timers_(timers), queue_(std::move(queue)), most_(most) {
   log_.setLineLimits(this);
 }
 
@@ -42,7 +43,7 @@ bool LineLimits::admits(uint32_t user, const char* format) {
   Lines& lines = lines_[{user, format}];
   // A window that has left lines out ends when that is told.
   if (lines.leftOut == 0 && now >= lines.since + kWindow) lines = {now};
-  if (lines.written < Limits::maxLogLinesPerSecond) {
+  if (lines.written < most_) {
     ++lines.written;
     return true;
   }

@@ -1,4 +1,4 @@
-// Keeps the clients of one user from flooding the log: of each text at most `Limits::maxLogLinesPerSecond` lines a second
+// Keeps the clients of one user from flooding the log: of each text at most so many lines a second
 // of theirs are written; then one line says how many were left out. Lines of the debug level are never left out.
 //
 // The log asks for each line of another level that a thread writes while it works for a client, which a ClientScope
@@ -37,8 +37,8 @@ class ClientScope {
 
 class LineLimits {
  public:
-  // Everything outlives this. `queue` runs what tells how many lines were left out, a second later.
-  LineLimits(Log& log, Clock& clock, TimerService& timers, std::shared_ptr<SerialQueue> queue);
+  // Everything outlives this; `most` is of lines (Share::logLines). `queue` runs what tells how many lines were left out, a second later.
+  LineLimits(Log& log, Clock& clock, TimerService& timers, std::shared_ptr<SerialQueue> queue, uint64_t most);
   ~LineLimits();
   LineLimits(const LineLimits&) = delete;
   LineLimits& operator=(const LineLimits&) = delete;
@@ -61,6 +61,7 @@ class LineLimits {
   Clock& clock_;
   TimerService& timers_;
   const std::shared_ptr<SerialQueue> queue_;
+  const uint64_t most_;
   Mutex mutex_;
   std::map<Key, Lines> lines_ GUARDED_BY(mutex_);
   bool telling_ GUARDED_BY(mutex_) = false;  // a timer is set

@@ -43,14 +43,30 @@ OutstandingBytes::User& OutstandingBytes::user(const std::shared_ptr<UserAccount
   }
 }
 
+size_t OutstandingBytes::User::most() const {
+  return account_ ? account_->most(Share::requestBytes) : Limits::maxOutstandingBytes;
+}
+
+size_t OutstandingBytes::User::mostWaiting() const {
+  return account_ ? account_->most(Share::waitingBytes) : Limits::maxWaitingBytes;
+}
+
 bool OutstandingBytes::User::take(size_t bytes) {
   size_t before = bytes_.load(std::memory_order_relaxed);
   do {
-    if (before + bytes > Limits::maxOutstandingBytes) return false;
+    if (before + bytes > most()) return false;
   } while (!bytes_.compare_exchange_weak(before, before + bytes, std::memory_order_relaxed));
   if (!account_ || account_->take(Share::bytes, bytes, 2 * kLeftForMessages)) return true;
   bytes_.fetch_sub(bytes, std::memory_order_relaxed);
   return false;
+}
+
+bool OutstandingBytes::User::takeReply(size_t bytes) {
+  return !account_ || account_->take(Share::bytes, bytes, 2 * kLeftForMessages);
+}
+
+void OutstandingBytes::User::giveReplyBack(size_t bytes) {
+  if (account_) account_->giveBack(Share::bytes, bytes);
 }
 
 void OutstandingBytes::User::giveBack(size_t bytes) {

@@ -64,7 +64,7 @@ struct URLSessionConfiguration {
 };
 
 // What the requests of one session that have not completed count, for those who implement the port: each user's apart,
-// towards `Limits::maxOutstandingBytes` and towards what the user may hold in all. Any thread.
+// towards Share::requestBytes and towards what the user may hold in all. Any thread.
 class OutstandingBytes {
  public:
   class User {
@@ -73,9 +73,15 @@ class OutstandingBytes {
     // Whether there was room; then it counts until it is given back.
     [[nodiscard]] bool take(size_t bytes);
     void giveBack(size_t bytes);
+    // A reply's body, towards what the user may hold in all alone.
+    [[nodiscard]] bool takeReply(size_t bytes);
+    void giveReplyBack(size_t bytes);
+    // The most that may wait for a network.
+    [[nodiscard]] size_t mostWaiting() const;
 
    private:
     friend class OutstandingBytes;
+    [[nodiscard]] size_t most() const;
     const std::shared_ptr<UserAccount> account_;
     std::atomic<size_t> bytes_{0};
     User* next_ = nullptr;

@@ -31,6 +31,12 @@ UserShares UserShares::of(const Limits& limits, uint64_t memory, uint64_t descri
       limits.maxUploadingBytesPerUser.value_or(usualUploadingBytes(limits, partOfMemory));
   shares[Share::hierarchyTokens] = limits.maxHierarchyTokensPerUser;
   shares[Share::sharedDataBytes] = limits.maxSharedDataBytesPerUser;
+  shares[Share::requestBytes] = Limits::maxOutstandingBytes;
+  shares[Share::waitingBytes] = Limits::maxWaitingBytes;
+  shares[Share::messageLogBytes] = Limits::maxMessageLogBytesPerUser;
+  shares[Share::identifiers] = limits.maxCustomIdentifiersPerUser;
+  shares[Share::logLines] = Limits::maxLogLinesPerSecond;
+  shares[Share::workers] = Limits::maxWorkersPerUser;
   return shares;
 }
 
@@ -78,8 +84,8 @@ Charge& Charge::operator=(Charge&& other) noexcept {
   return *this;
 }
 
-bool Charge::set(uint64_t amount) {
-  if (account_ && amount > amount_ && !account_->take(share_, amount - amount_)) return false;
+bool Charge::set(uint64_t amount, unsigned leaving) {
+  if (account_ && amount > amount_ && !account_->take(share_, amount - amount_, leaving)) return false;
   if (account_ && amount < amount_) account_->giveBack(share_, amount_ - amount);
   amount_ = amount;
   return true;

@@ -1,6 +1,7 @@
 // What each user's clients may hold of the daemon at once, so that a client hurts none but its own user. One place for
-// all such limits: connections, descriptors, bytes and the rest, each a row of `UserShares`. A user is the one that the
-// kernel names as the connection's other end, whatever its clients say.
+// all such limits, each a row of `kShareRows` and a number in `UserShares`: those that an account counts here, and those
+// that are counted where they are held, by who reads the number here. docs/SECURITY.md has the same table. A user is the
+// one that the kernel names as the connection's other end, whatever its clients say.
 //
 // Whoever keeps something on behalf of a client takes it from the user's account first, with a Charge where it can,
 // and does without when the account refuses. What exists already and must be kept is taken anyway, and makes the
@@ -23,14 +24,46 @@ namespace kyt {
 struct Limits;
 
 enum class Share : uint8_t {
+  // Counted in the user's account.
   connections,  // those that are ending included
   descriptors,  // of connections, and those that came with messages and wait for the rest of them
-  bytes,  // memory: connections, half messages, replies, session information, batches, posts, hierarchies
+  // Memory: connections, half messages, replies to the client and of servers, session information, batches, posts,
+  // datagrams, hierarchies.
+  bytes,
   uploadedBytes,    // of files, in memory until they are answered
   hierarchyTokens,  // they stay for the life of the process
   sharedDataBytes,  // so does this
+  // Counted by their holder.
+  requestBytes,     // URLSession: not answered yet, in each session
+  waitingBytes,     // … of these, waiting for a network
+  messageLogBytes,  // MessageLogFiles: in one file, since the daemon started
+  identifiers,      // TomlUserDefaults: custom ones of its programs, kept on disk for good
+  logLines,         // LineLimits: of each text a second
+  workers,          // WorkerPool: that run its connections, or wait in them
   numberOfShares
 };
+
+// What people call them; `setting` is a key of "[limits]", empty where there is none.
+struct ShareRow {
+  Share share;
+  const char* name;
+  const char* unit;
+  const char* setting;
+};
+inline constexpr std::array<ShareRow, static_cast<size_t>(Share::numberOfShares)> kShareRows{{
+    {Share::connections, "connections", "connections", "max_connections_per_user"},
+    {Share::descriptors, "descriptors", "descriptors", "max_descriptors_per_user"},
+    {Share::bytes, "bytes", "bytes", "max_bytes_per_user"},
+    {Share::uploadedBytes, "bytes of files", "bytes", "max_uploading_bytes_per_user"},
+    {Share::hierarchyTokens, "hierarchy tokens", "tokens", "max_hierarchy_tokens_per_user"},
+    {Share::sharedDataBytes, "shared data", "bytes", "max_shared_data_bytes_per_user"},
+    {Share::requestBytes, "requests", "bytes", ""},
+    {Share::waitingBytes, "waiting requests", "bytes", ""},
+    {Share::messageLogBytes, "message log", "bytes", ""},
+    {Share::identifiers, "identifiers", "identifiers", "max_custom_identifiers_per_user"},
+    {Share::logLines, "log lines", "lines a second", ""},
+    {Share::workers, "workers", "threads", ""},
+}};
 
 // What can be dropped piece by piece (events, posts, shared data) leaves such a part of the bytes to what else would
 // end a connection: half messages and replies.
@@ -78,6 +111,7 @@ class UserBudget {
   explicit UserBudget(const UserShares& shares) : shares_(shares) {}
   // Changed only before there are accounts.
   [[nodiscard]] UserShares& shares() { return shares_; }
+  [[nodiscard]] uint64_t most(Share share) const { return shares_[share]; }
   // The user's one account. It is forgotten once nobody has it and it holds nothing.
   [[nodiscard]] std::shared_ptr<UserAccount> account(uint32_t user) EXCLUDES(mutex_);
   [[nodiscard]] size_t accountCount() const EXCLUDES(mutex_);
@@ -100,7 +134,8 @@ class Charge {
   ~Charge() { clear(); }
 
   // False when the account has no room for what is more than before: then nothing has changed.
-  [[nodiscard]] bool set(uint64_t amount);
+  // `leaving` as of UserAccount::take().
+  [[nodiscard]] bool set(uint64_t amount, unsigned leaving = 0);
   [[nodiscard]] bool add(uint64_t amount) { return set(amount_ + amount); }
   void setAnyway(uint64_t amount);
   void clear() { setAnyway(0); }

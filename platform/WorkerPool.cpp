@@ -52,7 +52,8 @@ class WorkerPool::Implementation {
   explicit Implementation(WorkerPoolOptions options) : options_(options) {
     if (options_.runnable == 0) options_.runnable = std::max(2u, std::thread::hardware_concurrency());
     options_.maxWorkers = std::max<size_t>(options_.maxWorkers, 1);
-    mostOfOneOwner_ = std::max<size_t>(options_.maxWorkers / 2, 1);
+    mostOfOneOwner_ = options_.mostOfOneOwner;
+    if (mostOfOneOwner_ == 0) mostOfOneOwner_ = std::max<size_t>(options_.maxWorkers / 2, 1);
   }
 
   void submit(std::shared_ptr<SerialQueue> queue);

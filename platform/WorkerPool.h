@@ -26,7 +26,8 @@ class Log;
 
 struct WorkerPoolOptions {
   size_t runnable = 0;  // workers that may run without being blocked; 0: the number of processors, at least 2
-  size_t maxWorkers = 512;  // threads in all
+  size_t maxWorkers = 512;    // threads in all
+  size_t mostOfOneOwner = 0;  // of these; 0: half of them
   Duration idleExit = std::chrono::seconds(10);
   const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
   void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name

@@ -48,8 +48,13 @@ std::string dateText(const std::optional<Date>& date) {
 }  // namespace
 
 MessageLogFiles::MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log,
-                                 Counters& counters)
-    : folder_(std::move(folder)), files_(files), clock_(clock), log_(log), counters_(counters) {}
+                                 Counters& counters, uint64_t mostOfUser)
+    : folder_(std::move(folder)),
+      files_(files),
+      clock_(clock),
+      log_(log),
+      counters_(counters),
+      mostOfUser_(mostOfUser) {}
 
 double MessageLogFiles::now() const {
   return clock_.timeOfDay().asSeconds();
@@ -89,7 +94,7 @@ bool MessageLogFiles::takeShare(uint32_t user, const std::string& path, size_t b
       shares_.clear();
     }
     uint64_t& used = shares_[user];
-    if (bytes <= Limits::maxMessageLogBytesPerUser - used) {
+    if (bytes <= mostOfUser_ - used) {
       used += bytes;
       return true;
     }

@@ -1,8 +1,8 @@
 // The local message log as files: one line for each call, in a file that is current for a day after its
 // creation and then deleted by the next call, or by the one that finds it full. At most one file stays; every call
 // lists the folder, so this is for a low rate of lines. Files of other names in the folder are left alone. Of each
-// user's clients no more than Limits::maxMessageLogBytesPerUser are written to a file, as far as this object knows;
-// what is more is dropped and counted.
+// user's clients no more than a share is written to a file, as far as this object knows: a file's lines do not name their
+// user, so after a restart the shares of a day's file begin anew. What is more is dropped and counted.
 //
 // Takes no lock but for these sums: each call opens, appends and closes within itself, and a line is appended in one
 // piece, so two calls at once do no more than start two files, of which the next call keeps the newer.
@@ -26,8 +26,9 @@ class Log;
 
 class MessageLogFiles final : public MessageLog {
  public:
-  // All that is handed in outlives the log. The folder is made when it is missing, if the system allows that.
-  MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log, Counters& counters);
+  // All that is handed in outlives the log. `mostOfUser` is in bytes (Share::messageLogBytes). The folder is made when it is missing, if the system allows that.
+  MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log, Counters& counters,
+                  uint64_t mostOfUser);
 
   // Line breaks within a line stay: they are those of texts that back ends laid out. Other control characters
   // and invalid UTF-8 are escaped. What a client sent as it is must have been escaped by the caller.
@@ -56,6 +57,7 @@ class MessageLogFiles final : public MessageLog {
   const Clock& clock_;
   Log& log_;
   Counters& counters_;
+  const uint64_t mostOfUser_;
   Mutex mutex_;
   std::string sharedFile_ GUARDED_BY(mutex_);               // which one these are the users' parts of
   std::map<uint32_t, uint64_t> shares_ GUARDED_BY(mutex_);  // bytes

@@ -45,8 +45,16 @@ void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID e
   networkProcQueue_->assertCurrent();
   const bool sent = send({datagram.bytes(), datagram.length()});
   if (sent && !reliableUDP_) return;
+  // Where the user's memory is used up, older ones of this back end give way; without any this one is not kept.
+  Charge charge(userAccount(), Share::bytes);
+  while (!charge.set(UDPPacketToSend::kCost + datagram.length(), kLeftForMessages)) {
+    platform().counters.add(Reason::datagramDisplaced);
+    if (messageQueue_.empty()) return;
+    messageQueue_.pop_front();
+  }
   auto packet =
       UDPPacketToSend::initWithBytes(datagram.bytes(), datagram.length(), static_cast<uint16_t>(eventNumber));
+  packet->setCharge(std::move(charge));
   if (sent) packet->setState(UDPPacketToSend::kWaiting);
   messageQueue_.push_back(std::move(packet));
   if (messageQueue_.size() <= kMaxPackets) return;

@@ -7,6 +7,7 @@
 #include <memory>
 #include <span>
 
+#include "platform/UserBudget.h"
 #include "platform/Value.h"
 
 namespace kyt {
@@ -15,6 +16,9 @@ class UDPPacketToSend {
  public:
   static constexpr int32_t kUnsent = 0;   // it has not gone out in full yet
   static constexpr int32_t kWaiting = 1;  // for its acknowledgement
+
+  // What a packet costs besides its bytes.
+  static constexpr size_t kCost = 192;
 
   // Copies the bytes.
   [[nodiscard]] static std::unique_ptr<UDPPacketToSend> initWithBytes(const std::byte* bytes, uint16_t length,
@@ -36,6 +40,8 @@ class UDPPacketToSend {
   void setEventNumber(uint16_t value) { eventNumber_ = value; }
   [[nodiscard]] const Data& data() const { return data_; }
   void setData(Data value) { data_ = std::move(value); }
+  // What it counts towards the memory of its user.
+  void setCharge(Charge charge) { charge_ = std::move(charge); }
 
  private:
   int32_t state_ = kUnsent;
@@ -43,6 +49,7 @@ class UDPPacketToSend {
   int32_t numberOfRetransmits_ = 0;
   uint16_t eventNumber_ = 0;
   Data data_;
+  Charge charge_;
 };
 
 }  // namespace kyt

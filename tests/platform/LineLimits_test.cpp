@@ -33,7 +33,7 @@ class LinesOfAUser : public ::testing::Test {
   ManualClock clock_;
   ManualTimers timers_{clock_};
   ManualExecutor executor_;
-  LineLimits limits_{log_, clock_, timers_, SerialQueue::create("test", executor_)};
+  LineLimits limits_{log_, clock_, timers_, SerialQueue::create("test", executor_), kMost};
 };
 
 TEST_F(LinesOfAUser, PastTheMostOfASecondAreLeftOutAndTold) {

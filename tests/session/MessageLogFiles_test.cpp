@@ -49,7 +49,7 @@ class MessageLogFilesTest : public testing::Test {
   MemoryLogSink sink_;
   Log systemLog_{sink_, LogLevel::debug};
   Counters counters_;
-  MessageLogFiles log_{kFolder, files_, clock_, systemLog_, counters_};
+  MessageLogFiles log_{kFolder, files_, clock_, systemLog_, counters_, Limits::maxMessageLogBytesPerUser};
 };
 
 TEST_F(MessageLogFilesTest, MakesTheFolderAndAFileNamedAfterTheSecond) {

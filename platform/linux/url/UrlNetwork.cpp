@@ -325,6 +325,11 @@ void URLNetwork::refuse(URLTransfer& transfer) {
   fail(transfer, kURLErrorOutstandingTooMuch, "Too much was outstanding");
 }
 
+void URLNetwork::countReplyWithoutRoom() {
+  if (!counters_.addAndMayLog(Reason::outstandingBytesExceeded, now_)) return;
+  log_.error("CurlURLSession(receiveBody): no room for a reply, it is broken off");
+}
+
 void URLNetwork::activate(URLTransfer& transfer) {
   if (!lines_.mayGo(transfer)) {
     transfer.phase = URLTransfer::Phase::inLine;

@@ -76,6 +76,7 @@ class URLNetwork {
   [[nodiscard]] size_t outstanding() const { return outstanding_.load(); }
 
   // The network thread's, for pools and transfers.
+  void countReplyWithoutRoom();
   [[nodiscard]] MonotonicTime now() const { return now_; }
   [[nodiscard]] DeadlineHeap& deadlines() { return deadlines_; }
   [[nodiscard]] IdlePools& idlePools() { return idlePools_; }

@@ -81,7 +81,8 @@ void URLNetwork::setAside(URLTransfer& transfer) {
   const std::shared_ptr<URLSessionState> kept = transfer.session;  // displacing may end its last request
   const bool listening = routeEvents_.descriptor() >= 0;
   // The list ends with its last request, which one that is larger than the limit is too.
-  while (waiting.bytes > Limits::maxWaitingBytes) {
+  const size_t most = transfer.user->mostWaiting();
+  while (waiting.bytes > most) {
     const bool last = waiting.transfers.first() == &transfer;
     displace(*waiting.transfers.first());
     if (last) break;
@@ -97,7 +98,7 @@ void URLNetwork::displace(URLTransfer& oldest) {
   if (counters_.addAndMayLog(Reason::waitingRequestDisplaced, now_)) {
     log_.error(
         "CurlURLSession(setAside): more than %zu bytes wait for connectivity, dropping the oldest request",
-        Limits::maxWaitingBytes);
+        oldest.user->mostWaiting());
   }
   fail(oldest, kURLErrorWaitingTooMuch, "Too much was waiting for connectivity");
 }

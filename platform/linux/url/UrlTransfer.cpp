@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <charconv>
 #include <cstring>
+#include <utility>
 
 #include "platform/Limits.h"
 #include "platform/linux/url/UrlNetwork.h"
@@ -62,6 +63,10 @@ URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, URLRequest want
           this),
       completion_(std::move(completion)) {}
 
+URLTransfer::~URLTransfer() {
+  giveReplyBack();
+}
+
 void URLTransfer::cancel() {
   session->network->cancel(shared_from_this());
 }
@@ -73,6 +78,7 @@ void URLTransfer::deliver() {
     completion(std::move(data_), answered ? std::optional(std::move(response_)) : std::nullopt,
                std::move(error_));
   }
+  giveReplyBack();
   session->network->completionHasRun();
 }
 
@@ -92,6 +98,7 @@ void URLTransfer::takeError(int32_t code, std::string description) {
 
 void URLTransfer::clearReply() {
   body_ = {};
+  giveReplyBack();
   response_ = {};
   headerBytes_ = 0;
   moved_ = 0;
@@ -222,10 +229,29 @@ size_t URLTransfer::receiveHeader(char* bytes, size_t size, size_t count, void* 
 size_t URLTransfer::receiveBody(char* bytes, size_t size, size_t count, void* transfer) {
   auto& self = *static_cast<URLTransfer*>(transfer);
   self.lastProgress = self.session->network->now();
-  self.replyTooLong = self.body_.size() + size * count > Limits::maxHTTPReplyBytes;
+  const size_t length = self.body_.size() + size * count;
+  self.replyTooLong = length > Limits::maxHTTPReplyBytes || !self.hasRoomFor(length);
   if (self.replyTooLong) return 0;
   self.body_.append(bytes, size * count);
   return size * count;
+}
+
+// Mostly what a request counts covers its reply too. What is more counts in large steps.
+bool URLTransfer::hasRoomFor(size_t bodyBytes) {
+  constexpr size_t kStep = 65536;
+  const size_t covered = Limits::freeBytes + replyCharge_;
+  if (bodyBytes <= covered) return true;
+  const size_t more = std::max(kStep, bodyBytes - covered);
+  if (!user->takeReply(more)) {
+    session->network->countReplyWithoutRoom();
+    return false;
+  }
+  replyCharge_ += more;
+  return true;
+}
+
+void URLTransfer::giveReplyBack() {
+  if (replyCharge_ != 0) user->giveReplyBack(std::exchange(replyCharge_, 0));
 }
 
 int URLTransfer::noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent) {

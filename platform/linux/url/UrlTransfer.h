@@ -27,6 +27,9 @@ struct URLSessionState;
 class URLTransfer final : public URLTask, public std::enable_shared_from_this<URLTransfer> {
  public:
   URLTransfer(std::shared_ptr<URLSessionState> session, URLRequest request, URLCompletion completion);
+  ~URLTransfer() override;
+  URLTransfer(const URLTransfer&) = delete;
+  URLTransfer& operator=(const URLTransfer&) = delete;
   void cancel() override;
 
   // Delegate queue: calls the completion with the result.
@@ -94,12 +97,15 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   static int noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent);
   static curl_socket_t openSocket(void* transfer, curlsocktype, curl_sockaddr* address);
 
+  [[nodiscard]] bool hasRoomFor(size_t bodyBytes);
+  void giveReplyBack();
   [[nodiscard]] bool mayBeRepeated() const { return request.method == "GET" || request.method == "HEAD"; }
 
   URLCompletion completion_;
   std::string headerText_;              // all header lines, each ended by a zero
   std::vector<curl_slist> headerList_;  // points into headerText_
   std::string body_;
+  size_t replyCharge_ = 0;  // for it, until the completion has run
   curl_off_t moved_ = 0;
   size_t headerBytes_ = 0;
   URLResponse response_;

@@ -158,6 +158,33 @@ TEST_F(DashboardDelivery, OfManyUnacknowledgedOnesTheNewestStay) {
   EXPECT_EQ(queued().front(), 2);
 }
 
+TEST_F(DashboardDelivery, WhatWaitsCountsForItsUserAndOlderOnesGiveWay) {
+  const auto account = platform_.budget.account(1000);
+  ASSERT_NE(make(reliable()), nullptr);
+  backend_->setUserAccount(account);
+  send(1);
+  const uint64_t one = account->holds(Share::bytes);
+  EXPECT_GE(one, UDPPacketToSend::kCost + DashboardDatagram::kHeaderSize);
+  send(2);
+  send(3);
+  EXPECT_EQ(account->holds(Share::bytes), 3 * one);
+  const uint64_t most = account->most(Share::bytes);
+  account->takeAnyway(Share::bytes, most - most / kLeftForMessages - 3 * one);
+  send(4);
+  EXPECT_EQ(queued(), (std::vector<uint16_t>{2, 3, 4}));
+  EXPECT_EQ(platform_.counters.value(Reason::datagramDisplaced), 1u);
+  account->takeAnyway(Share::bytes, 3 * one);
+  send(5);
+  EXPECT_EQ(queued(), std::vector<uint16_t>());
+  EXPECT_EQ(platform_.counters.value(Reason::datagramDisplaced), 5u);
+  account->giveBack(Share::bytes, most - most / kLeftForMessages);
+  EXPECT_TRUE(account->holdsNothing());
+  send(6);
+  backend_.reset();
+  platform_.executor.runAll();
+  EXPECT_TRUE(account->holdsNothing());
+}
+
 TEST_F(DashboardDelivery, InPlainModeWhatWentOutIsForgotten) {
   ASSERT_NE(make(profile()), nullptr);
   send(1);

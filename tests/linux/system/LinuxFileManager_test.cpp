@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include "platform/Counters.h"
+#include "platform/Limits.h"
 #include "platform/Log.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/linux/base/LinuxClock.h"
@@ -21,7 +22,8 @@ namespace {
 constexpr uid_t kNobody = 65534;
 
 struct RealLog {
-  explicit RealLog(const std::string& folder) : messages(folder, files, clock, log, counters) {}
+  explicit RealLog(const std::string& folder)
+      : messages(folder, files, clock, log, counters, Limits::maxMessageLogBytesPerUser) {}
   LinuxClock clock;
   LinuxFileManager files;
   MemoryLogSink sink;

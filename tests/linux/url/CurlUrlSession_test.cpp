@@ -11,6 +11,7 @@
 
 #include "platform/Limits.h"
 #include "platform/Semaphore.h"
+#include "platform/UserBudget.h"
 #include "tests/linux/url/CurlUrlSessionFixture.h"
 #include "tests/support/Sanitizers.h"
 
@@ -220,6 +221,46 @@ TEST_F(CurlURLSession, CountsRefusedRequestsAndSaysSoOnce) {
   EXPECT_EQ(sink_.count("CurlURLSession(start): more than 67108864 bytes of requests are outstanding"), 1u);
   EXPECT_EQ(factory().figures().failed, 2u);
   for (const Outcome& outcome : kept) EXPECT_FALSE(outcome.isDone());
+}
+
+// A server chooses the length of its replies, and a client may choose the server.
+TEST_F(CurlURLSession, CountsARepliesBodyForItsUserUntilTheCompletionHasRun) {
+  constexpr size_t kReply = 3u << 20;
+  Limits limits;
+  limits.maxBytesPerUser = 2 * kReply;
+  UserBudget budget(UserShares::of(limits, 0, 0));
+  TestHTTPServer::Reply large;
+  large.body = std::string(kReply, 'r');
+  server_.setReply(large);
+  auto urls = session();
+  const auto start = [&](uint32_t user, URLCompletion completion) {
+    URLRequest request = post(server_.url("/"), "x");
+    request.account = budget.account(user);
+    urls->start(std::move(request), std::move(completion));
+  };
+  const auto account = budget.account(1);
+  std::atomic<uint64_t> held{0};
+  Outcome whole, brokenOff, ofAnother;
+  start(1, [&, done = whole.completion()](std::optional<Data> data, std::optional<URLResponse> response,
+                                          std::optional<Error> error) mutable {
+    held = account->holds(Share::bytes);
+    done(std::move(data), std::move(response), std::move(error));
+  });
+  ASSERT_TRUE(whole.wait());
+  EXPECT_EQ(whole.body().size(), kReply) << whole.errorText();
+  EXPECT_GE(held, kReply - Limits::freeBytes);
+  EXPECT_TRUE(eventually([&] { return account->holdsNothing(); }));
+
+  account->takeAnyway(Share::bytes, kReply);
+  start(1, brokenOff.completion());
+  start(2, ofAnother.completion());
+  ASSERT_TRUE(brokenOff.wait() && ofAnother.wait());
+  EXPECT_EQ(brokenOff.status(), 200) << "what the server has decided on counts";
+  EXPECT_EQ(brokenOff.errorCode(), CURLE_FILESIZE_EXCEEDED);
+  EXPECT_EQ(ofAnother.body().size(), kReply) << ofAnother.errorText();
+  EXPECT_EQ(counters_.value(Reason::outstandingBytesExceeded), 1u);
+  EXPECT_EQ(sink_.count("CurlURLSession(receiveBody): no room for a reply"), 1u);
+  EXPECT_TRUE(eventually([&] { return account->holds(Share::bytes) == kReply; }));
 }
 
 // The signals that a thread of this process blocks, by its name; nothing when there is no such thread.
