@@ -2,10 +2,10 @@
 
 #include "config/DeviceIdentity.h"
 #include "platform/Bundle.h"
-#include "platform/Clock.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Clock.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -4,14 +4,14 @@
 #include <vector>
 
 #include "backend/Text.h"
-#include "platform/Counters.h"
 #include "platform/Cryptography.h"
 #include "platform/Platform.h"
 #include "platform/RandomSource.h"
-#include "platform/SerialQueue.h"
-#include "platform/UUIDText.h"
-#include "platform/UserBudget.h"
 #include "platform/UserDefaults.h"
+#include "platform/base/Counters.h"
+#include "platform/base/UUIDText.h"
+#include "platform/base/UserBudget.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

@@ -22,11 +22,11 @@
 #include "backend/ReportingSessionConnectivityInterface.h"
 #include "backend/SessionFacts.h"
 #include "backend/SessionIDPath.h"
-#include "platform/Clock.h"
-#include "platform/Error.h"
 #include "platform/FileExtension.h"
-#include "platform/Function.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Error.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

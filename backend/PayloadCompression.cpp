@@ -1,8 +1,8 @@
 #include "backend/PayloadCompression.h"
 
 #include "platform/Deflate.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -5,7 +5,7 @@
 #include <optional>
 
 #include "platform/Cryptography.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

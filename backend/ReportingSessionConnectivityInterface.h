@@ -1,7 +1,7 @@
 // All that a back end knows of the poster: one operation that sends a prepared request.
 #pragma once
 
-#include "platform/UrlSession.h"
+#include "platform/URLSession.h"
 
 namespace kyt {
 

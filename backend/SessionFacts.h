@@ -8,8 +8,8 @@
 #include <memory>
 #include <optional>
 
-#include "platform/Clock.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

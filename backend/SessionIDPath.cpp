@@ -1,6 +1,6 @@
 #include "backend/SessionIDPath.h"
 
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

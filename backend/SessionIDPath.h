@@ -9,7 +9,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -4,7 +4,7 @@
 #include <iterator>
 
 #include "backend/CaseFoldingTable.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

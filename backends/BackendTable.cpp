@@ -5,7 +5,7 @@
 #include "backends/https/HTTPSPostBackend.h"
 #include "backends/qdx/QDXBackend.h"
 #include "backends/upload/UploadBackend.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 
 namespace kyt {
 

@@ -4,9 +4,9 @@
 
 #include <random>
 
-#include "platform/Keys.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageWriter.h"
+#include "platform/objects/Keys.h"
 
 namespace kyt::bench {
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::bench {
 

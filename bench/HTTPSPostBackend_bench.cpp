@@ -6,8 +6,8 @@
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "bench/Corpus.h"
-#include "platform/Keys.h"
-#include "platform/SerialQueue.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

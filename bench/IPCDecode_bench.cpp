@@ -9,12 +9,10 @@
 #include <vector>
 
 #include "bench/Corpus.h"
-#include "platform/Counters.h"
 #include "platform/Entitlements.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/UserBudget.h"
-#include "platform/Value.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
@@ -26,6 +24,8 @@
 #include "platform/ipc/MessageReader.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/ipc/WireText.h"
+#include "platform/objects/Value.h"
+#include "platform/queues/Log.h"
 
 namespace {
 

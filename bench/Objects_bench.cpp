@@ -10,8 +10,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Value.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/RapidJSON.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 namespace {
@@ -149,7 +149,7 @@ BENCHMARK(FindEveryKey);
 
 void WriteJSON(benchmark::State& state) {
   const Value made(record(texts(), 1));
-  RapidJSONWriter json;
+  RapidJSON json;
   std::string out;
   for (auto _ : state) {
     out.clear();

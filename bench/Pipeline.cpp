@@ -6,7 +6,7 @@
 
 #include "backend/KYTReportingBackend.h"
 #include "bench/Corpus.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 
 namespace kyt::bench {
 

@@ -22,10 +22,10 @@
 #include <string>
 #include <thread>
 
-#include "platform/Counters.h"
-#include "platform/Log.h"
-#include "platform/Semaphore.h"
-#include "platform/linux/url/CurlUrlSession.h"
+#include "platform/base/Counters.h"
+#include "platform/linux/url/CurlURLSession.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/Semaphore.h"
 
 namespace {
 

@@ -19,11 +19,11 @@
 #include <thread>
 #include <vector>
 
-#include "platform/SerialQueue.h"
-#include "platform/WorkerPool.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/Threads.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

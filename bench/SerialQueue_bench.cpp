@@ -7,10 +7,10 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/Semaphore.h"
-#include "platform/SerialQueue.h"
-#include "platform/WorkerPool.h"
 #include "platform/fake/ManualExecutor.h"
+#include "platform/queues/Semaphore.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "client/Session.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 #include "platform/linux/client/ClientSocket.h"
 
 namespace kyt::client {

@@ -16,7 +16,7 @@
 #include "client/Kept.h"
 #include "client/MessageRing.h"
 #include "client/Standing.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/linux/client/ClientSocket.h"
 

@@ -6,8 +6,8 @@
 #include <utility>
 
 #include "client/Command.h"
-#include "platform/SessionInfoKeys.h"
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
+#include "platform/objects/SessionInfoKeys.h"
 
 namespace kyt {
 

@@ -3,7 +3,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
 #include "platform/linux/client/ClientSocket.h"
 
 namespace kyt::client {

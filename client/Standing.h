@@ -11,7 +11,7 @@
 #include <utility>
 
 #include "kytreporting/KYTReporting.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::client {
 

@@ -3,7 +3,7 @@
 
 #include <cstddef>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::client {
 

@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <optional>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -4,7 +4,7 @@
 
 #include "platform/DeviceProperties.h"
 #include "platform/RandomSource.h"
-#include "platform/UUIDText.h"
+#include "platform/base/UUIDText.h"
 
 namespace kyt {
 

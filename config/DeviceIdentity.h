@@ -9,7 +9,7 @@
 #include <string>
 
 #include "platform/Platform.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

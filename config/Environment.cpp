@@ -1,8 +1,8 @@
 #include "config/Environment.h"
 
 #include "config/DeviceIdentity.h"
-#include "platform/Log.h"
 #include "platform/UserDefaults.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -10,9 +10,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Mutex.h"
 #include "platform/Platform.h"
-#include "platform/Value.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

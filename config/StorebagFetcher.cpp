@@ -8,14 +8,14 @@
 
 #include "config/ClientTypes.h"
 #include "config/Environment.h"
-#include "platform/Base64.h"
 #include "platform/Bundle.h"
-#include "platform/Description.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
 #include "platform/PropertyLists.h"
-#include "platform/Semaphore.h"
+#include "platform/objects/Base64.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 

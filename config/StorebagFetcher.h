@@ -20,9 +20,9 @@
 
 #include "config/Configuration.h"
 #include "platform/Cryptography.h"
-#include "platform/Mutex.h"
-#include "platform/UrlSession.h"
-#include "platform/Value.h"
+#include "platform/URLSession.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -9,7 +9,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/Log.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -1,7 +1,7 @@
 #include "daemon/HealthReport.h"
 
-#include "platform/Description.h"
-#include "platform/Log.h"
+#include "platform/objects/Description.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

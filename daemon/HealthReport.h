@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "config/ClientTypes.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

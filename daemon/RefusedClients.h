@@ -5,8 +5,8 @@
 #include <cstdint>
 #include <map>
 
-#include "platform/Clock.h"
-#include "platform/Mutex.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

@@ -4,11 +4,11 @@
 #include <chrono>
 #include <utility>
 
-#include "platform/Keys.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
 #include "platform/ProcessTransaction.h"
+#include "platform/base/Limits.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

@@ -26,10 +26,10 @@
 #include "daemon/RefusedClients.h"
 #include "daemon/SessionCensus.h"
 #include "daemon/SharedDataStore.h"
-#include "platform/Clock.h"
-#include "platform/Mutex.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/Listener.h"
+#include "platform/objects/Value.h"
 #include "session/ReportingdSessionDelegate.h"
 
 namespace kyt {

@@ -4,11 +4,11 @@
 #include <utility>
 
 #include "daemon/ReportingdAgent.h"
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

@@ -2,12 +2,12 @@
 // is kept for clients: what a user shares is limited (daemon/SharedDataStore.h).
 #include "daemon/HealthReport.h"
 #include "daemon/ReportingdAgent.h"
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/MemoryInfo.h"
-#include "platform/ObjectSize.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/objects/MemoryInfo.h"
+#include "platform/objects/ObjectSize.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

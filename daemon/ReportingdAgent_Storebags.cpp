@@ -6,9 +6,9 @@
 #include "config/ClientTypes.h"
 #include "config/StorebagFetcher.h"
 #include "daemon/ReportingdAgent.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

@@ -9,8 +9,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/UserBudget.h"
-#include "platform/Value.h"
+#include "platform/base/UserBudget.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -9,7 +9,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

@@ -1,15 +1,15 @@
 #include "devserver/BagSigner.h"
 
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/linux/data/RapidJSON.h"
 #include "tools/StorebagFile.h"
 
 namespace kyt::devserver {
 
 std::variant<std::string, SigningError> BagSigner::sign(std::string_view bag, std::string_view format) const {
   PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
+  RapidJSON json;
   OpenSSLCryptography cryptography;
   const tools::StorebagFile file(propertyLists, json, cryptography);
   const auto read = file.read(bag, format);

@@ -10,7 +10,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

@@ -3,8 +3,8 @@
 #include <openssl/sha.h>
 
 #include "devserver/Text.h"
-#include "platform/KeyedArchive.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/RapidJSON.h"
+#include "platform/objects/KeyedArchive.h"
 
 namespace kyt::devserver {
 namespace {
@@ -48,7 +48,7 @@ LogData readLogData(std::string_view body) {
   else
     out.reason = "the archive holds no array";
   out.json.clear();
-  RapidJSONWriter().writeCompact(shown(value), out.json);
+  RapidJSON().writeCompact(shown(value), out.json);
   return out;
 }
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "devserver/Post.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

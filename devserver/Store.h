@@ -18,7 +18,7 @@
 
 #include "devserver/Database.h"
 #include "devserver/Post.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

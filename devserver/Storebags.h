@@ -20,7 +20,7 @@
 #include <tuple>
 
 #include "devserver/BagSigner.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

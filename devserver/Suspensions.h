@@ -12,7 +12,7 @@
 #include <thread>
 
 #include "devserver/Http.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 

@@ -6,7 +6,7 @@
 #include <string_view>
 
 #include "devserver/Datagram.h"
-#include "platform/KeyedArchive.h"
+#include "platform/objects/KeyedArchive.h"
 
 namespace {
 

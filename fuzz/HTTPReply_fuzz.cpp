@@ -12,11 +12,11 @@
 #include <string>
 #include <thread>
 
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/Semaphore.h"
-#include "platform/linux/url/CurlUrlSession.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/linux/url/CurlURLSession.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/Semaphore.h"
 
 namespace {
 

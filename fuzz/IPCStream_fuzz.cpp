@@ -7,11 +7,10 @@
 #include <memory>
 #include <string>
 
-#include "platform/Counters.h"
 #include "platform/Entitlements.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
@@ -21,6 +20,7 @@
 #include "platform/ipc/DBusServer.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageReader.h"
+#include "platform/queues/Log.h"
 
 namespace {
 

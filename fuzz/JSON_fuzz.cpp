@@ -4,10 +4,10 @@
 #include <cstdlib>
 #include <string>
 
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/RapidJSON.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  kyt::RapidJSONWriter json;
+  kyt::RapidJSON json;
   const auto read = json.parse({reinterpret_cast<const char*>(data), size});
   const auto* value = std::get_if<kyt::Value>(&read);
   if (value == nullptr) return 0;

@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <string>
 
-#include "platform/linux/PugixmlPropertyLists.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
 
 namespace {
 

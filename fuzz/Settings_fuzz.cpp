@@ -7,11 +7,11 @@
 #include <string>
 #include <string_view>
 
-#include "platform/TextEscape.h"
-#include "platform/linux/system/ConfinementProfile.h"
-#include "platform/linux/system/FlatToml.h"
-#include "platform/linux/system/TomlEntitlements.h"
-#include "platform/linux/system/TomlSettings.h"
+#include "platform/base/TextEscape.h"
+#include "platform/linux/confinement/ConfinementProfile.h"
+#include "platform/linux/entitlements/TomlEntitlements.h"
+#include "platform/linux/toml/FlatToml.h"
+#include "platform/linux/toml/TomlSettings.h"
 
 namespace kyt {
 namespace {

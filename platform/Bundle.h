@@ -4,7 +4,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -6,8 +6,8 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Clock.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

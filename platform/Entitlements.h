@@ -11,8 +11,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Descriptor.h"
-#include "platform/Value.h"
+#include "platform/base/Descriptor.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

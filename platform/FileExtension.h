@@ -13,8 +13,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Descriptor.h"
-#include "platform/Value.h"
+#include "platform/base/Descriptor.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -10,7 +10,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

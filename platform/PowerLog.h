@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <string_view>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -6,8 +6,8 @@
 #include <string_view>
 #include <variant>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

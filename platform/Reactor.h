@@ -17,7 +17,7 @@
 #include <memory>
 #include <utility>
 
-#include "platform/Function.h"
+#include "platform/base/Function.h"
 
 namespace kyt {
 

@@ -12,8 +12,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Descriptor.h"
 #include "platform/Entitlements.h"
+#include "platform/base/Descriptor.h"
 
 namespace kyt {
 

@@ -9,8 +9,8 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -2,8 +2,8 @@
 
 #include <utility>
 
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/queues/Log.h"
 #include "session/MessageLog.h"
 
 namespace kyt {

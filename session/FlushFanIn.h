@@ -9,9 +9,9 @@
 #include <cstdint>
 #include <optional>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
 #include "platform/ipc/ClientSessionInterface.h"
+#include "platform/objects/Value.h"
 #include "session/ReportingdSessionClass.h"
 
 namespace kyt {

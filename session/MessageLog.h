@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <initializer_list>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

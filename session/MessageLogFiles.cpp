@@ -5,13 +5,13 @@
 #include <utility>
 #include <variant>
 
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/Description.h"
 #include "platform/FileManager.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/TextEscape.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/TextEscape.h"
+#include "platform/objects/Description.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

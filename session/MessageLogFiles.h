@@ -13,8 +13,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Mutex.h"
-#include "platform/Value.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 #include "session/MessageLog.h"
 
 namespace kyt {

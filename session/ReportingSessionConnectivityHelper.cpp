@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 
 namespace kyt {
 

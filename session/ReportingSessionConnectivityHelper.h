@@ -10,7 +10,7 @@
 #include <memory>
 
 #include "backend/ReportingSessionConnectivityInterface.h"
-#include "platform/UrlSession.h"
+#include "platform/URLSession.h"
 
 namespace kyt {
 

@@ -4,18 +4,18 @@
 #include <cassert>
 #include <utility>
 
-#include "platform/Base64.h"
 #include "platform/Bundle.h"
-#include "platform/Counters.h"
-#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
-#include "platform/Keys.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/ObjectSize.h"
 #include "platform/Platform.h"
 #include "platform/RandomSource.h"
 #include "platform/UserDefaults.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/objects/Base64.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/objects/ObjectSize.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingSessionConnectivityHelper.h"
 #include "session/SessionInfoCheck.h"
 

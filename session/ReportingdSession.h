@@ -24,12 +24,12 @@
 
 #include "backend/BackendFactory.h"
 #include "config/DeviceIdentity.h"
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/UserBudget.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/UserBudget.h"
 #include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/Listener.h"
+#include "platform/objects/Value.h"
 #include "session/ReportingdSessionClass.h"
 #include "session/ReportingdSessionDelegate.h"
 

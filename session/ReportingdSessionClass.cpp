@@ -2,11 +2,11 @@
 
 #include "backend/BackendFactory.h"
 #include "config/DeviceIdentity.h"
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/MessageLog.h"
 #include "session/ReportingSessionConnectivityHelper.h"
 

@@ -11,8 +11,8 @@
 #include <optional>
 
 #include "config/Configuration.h"
-#include "platform/Mutex.h"
-#include "platform/Value.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -7,8 +7,8 @@
 #include <string>
 
 #include "backend/SessionIDPath.h"
-#include "platform/Mutex.h"
-#include "platform/Value.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

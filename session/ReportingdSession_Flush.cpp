@@ -3,10 +3,10 @@
 #include <memory>
 #include <utility>
 
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/FileURL.h"
 #include "session/FlushFanIn.h"
 #include "session/MessageLog.h"

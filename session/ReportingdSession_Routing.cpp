@@ -2,10 +2,10 @@
 // internal messages take too, and the one for single messages of clients that configure nothing.
 #include <utility>
 
-#include "platform/Counters.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/MessageLog.h"
 #include "session/ReportingdSession.h"
 

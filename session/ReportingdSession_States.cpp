@@ -1,9 +1,9 @@
 // What a session does for its hierarchy: reporting states, the combined session ID, aggregation, shared data.
 #include <utility>
 
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "session/ReportingdSession.h"
 
 namespace kyt {

@@ -2,13 +2,13 @@
 
 #include <span>
 
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/SessionInfoKeys.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/objects/Keys.h"
+#include "platform/objects/SessionInfoKeys.h"
+#include "platform/objects/Value.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

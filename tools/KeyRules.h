@@ -8,7 +8,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::tools {
 

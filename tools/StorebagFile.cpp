@@ -8,10 +8,10 @@
 
 #include <memory>
 
-#include "platform/Base64.h"
 #include "platform/Cryptography.h"
 #include "platform/JSON.h"
 #include "platform/PropertyLists.h"
+#include "platform/objects/Base64.h"
 #include "tools/TomlValues.h"
 
 namespace kyt::tools {

@@ -10,8 +10,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -5,7 +5,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/system/Toml.h"
+#include "platform/linux/toml/Toml.h"
 
 namespace kyt::tools {
 

@@ -2,9 +2,9 @@
 
 #include <utility>
 
-#include "platform/Counters.h"
 #include "platform/Platform.h"
 #include "platform/PowerLog.h"
+#include "platform/base/Counters.h"
 
 namespace kyt {
 

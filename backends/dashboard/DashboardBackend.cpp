@@ -7,10 +7,10 @@
 #include <vector>
 
 #include "config/ClientTypes.h"
-#include "platform/Counters.h"
-#include "platform/InternetAddress.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/base/InternetAddress.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

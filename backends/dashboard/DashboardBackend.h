@@ -25,9 +25,9 @@
 #include "backends/dashboard/DashboardDatagram.h"
 #include "backends/dashboard/UDPPacketToSend.h"
 #include "platform/Reactor.h"
-#include "platform/SerialQueue.h"
-#include "platform/Timer.h"
 #include "platform/UDPSocket.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

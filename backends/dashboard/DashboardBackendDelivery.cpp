@@ -2,9 +2,9 @@
 #include <array>
 
 #include "backends/dashboard/DashboardBackend.h"
-#include "platform/Counters.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -1,11 +1,11 @@
 // The upload of a client's log data: one HTTP request, whose answer says where it can be found.
 #include "backends/dashboard/DashboardBackend.h"
-#include "platform/Counters.h"
-#include "platform/KeyedArchive.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/Semaphore.h"
-#include "platform/TextEscape.h"
+#include "platform/base/Counters.h"
+#include "platform/base/TextEscape.h"
+#include "platform/objects/KeyedArchive.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 

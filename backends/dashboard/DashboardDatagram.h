@@ -7,7 +7,7 @@
 #include <cstdint>
 #include <string_view>
 
-#include "platform/Clock.h"
+#include "platform/base/Clock.h"
 
 namespace kyt {
 

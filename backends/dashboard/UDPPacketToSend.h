@@ -7,8 +7,8 @@
 #include <memory>
 #include <span>
 
-#include "platform/UserBudget.h"
-#include "platform/Value.h"
+#include "platform/base/UserBudget.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

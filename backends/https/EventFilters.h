@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "backend/Text.h"
-#include "platform/Function.h"
-#include "platform/Value.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -1,13 +1,13 @@
 #include "backends/https/HTTPSPostBackend.h"
 
-#include "platform/Counters.h"
-#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/SerialQueue.h"
 #include "platform/UserDefaults.h"
+#include "platform/base/Counters.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

@@ -25,7 +25,7 @@
 #include "backend/KYTReportingBackend.h"
 #include "backends/https/EventFilters.h"
 #include "config/Configuration.h"
-#include "platform/Counters.h"
+#include "platform/base/Counters.h"
 
 namespace kyt {
 

@@ -4,14 +4,14 @@
 #include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
-#include "platform/Counters.h"
-#include "platform/Keys.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/ObjectSize.h"
 #include "platform/Platform.h"
-#include "platform/SerialQueue.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
+#include "platform/objects/Keys.h"
+#include "platform/objects/ObjectSize.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

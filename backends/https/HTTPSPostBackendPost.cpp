@@ -7,16 +7,16 @@
 #include "config/ClientTypes.h"
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
-#include "platform/Clock.h"
-#include "platform/Counters.h"
 #include "platform/Cryptography.h"
-#include "platform/Description.h"
 #include "platform/JSON.h"
-#include "platform/Keys.h"
-#include "platform/LineLimits.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/UserBudget.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/LineLimits.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

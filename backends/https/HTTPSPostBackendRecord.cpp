@@ -8,10 +8,10 @@
 #include "backends/https/HTTPSPostBackend.h"
 #include "config/ClientTypes.h"
 #include "config/DeviceIdentity.h"
-#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/objects/Description.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -4,12 +4,12 @@
 #include "backend/Text.h"
 #include "backends/https/HTTPSPostBackend.h"
 #include "config/Environment.h"
-#include "platform/Counters.h"
-#include "platform/Description.h"
 #include "platform/DeviceProperties.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -3,9 +3,9 @@
 #include <string>
 #include <utility>
 
-#include "platform/Counters.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
+#include "platform/base/Counters.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

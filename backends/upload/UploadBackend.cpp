@@ -9,16 +9,16 @@
 #include <variant>
 
 #include "backend/PayloadCompression.h"
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/Description.h"
 #include "platform/FileExtension.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/Semaphore.h"
-#include "platform/TextEscape.h"
-#include "platform/WorkerPool.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/TextEscape.h"
+#include "platform/objects/Description.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/Semaphore.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

@@ -11,7 +11,7 @@
 #include <utility>
 
 #include "platform/DeviceProperties.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

@@ -8,9 +8,9 @@
 #include <string>
 #include <utility>
 
-#include "platform/Clock.h"
 #include "platform/FileManager.h"
-#include "platform/Mutex.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

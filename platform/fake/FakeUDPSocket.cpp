@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
-#include "platform/InternetAddress.h"
+#include "platform/base/InternetAddress.h"
 
 namespace kyt {
 

@@ -6,8 +6,8 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/Mutex.h"
 #include "platform/UserDefaults.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

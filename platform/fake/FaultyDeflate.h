@@ -7,7 +7,7 @@
 #include <optional>
 
 #include "platform/Deflate.h"
-#include "platform/Function.h"
+#include "platform/base/Function.h"
 
 namespace kyt {
 

@@ -5,8 +5,8 @@
 #include <initializer_list>
 #include <vector>
 
-#include "platform/Mutex.h"
 #include "platform/RandomSource.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

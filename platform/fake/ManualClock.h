@@ -2,8 +2,8 @@
 // otherwise, or pass with each look at the time of day. Any thread.
 #pragma once
 
-#include "platform/Clock.h"
-#include "platform/Mutex.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

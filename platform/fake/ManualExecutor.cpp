@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/SerialQueue.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

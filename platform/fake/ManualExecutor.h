@@ -6,8 +6,8 @@
 #include <deque>
 #include <memory>
 
-#include "platform/Executor.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
+#include "platform/queues/Executor.h"
 
 namespace kyt {
 

@@ -5,7 +5,7 @@
 #include <map>
 #include <utility>
 
-#include "platform/SerialQueue.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

@@ -7,8 +7,8 @@
 #include <memory>
 #include <vector>
 
-#include "platform/Timer.h"
 #include "platform/fake/ManualClock.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

@@ -5,8 +5,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Log.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -3,7 +3,7 @@
 #include <bit>
 #include <utility>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 #include "platform/ipc/BodyValidator.h"
 #include "platform/ipc/WireValues.h"
 

@@ -19,10 +19,10 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
 #include "platform/ipc/MessageReader.h"
 #include "platform/ipc/WireCursor.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -2,7 +2,7 @@
 
 #include <cstring>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 #include "platform/ipc/WireText.h"
 
 namespace kyt {

@@ -4,7 +4,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Counters.h"
+#include "platform/base/Counters.h"
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/BodyValidator.h"
 #include "platform/ipc/ClientSessionReplies.h"

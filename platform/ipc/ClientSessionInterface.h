@@ -11,11 +11,11 @@
 #include <optional>
 #include <utility>
 
-#include "platform/Descriptor.h"
-#include "platform/Error.h"
 #include "platform/FileExtension.h"
-#include "platform/Function.h"
-#include "platform/Value.h"
+#include "platform/base/Descriptor.h"
+#include "platform/base/Error.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

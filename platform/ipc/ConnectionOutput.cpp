@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 
 namespace kyt {
 namespace {

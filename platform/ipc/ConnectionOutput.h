@@ -13,10 +13,10 @@
 #include <memory>
 #include <string>
 
-#include "platform/Function.h"
-#include "platform/Mutex.h"
 #include "platform/Stream.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Function.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/UserBudget.h"
 #include "platform/ipc/MessageWriter.h"
 
 namespace kyt {

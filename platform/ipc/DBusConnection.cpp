@@ -4,11 +4,11 @@
 #include <cstring>
 #include <utility>
 
-#include "platform/Clock.h"
 #include "platform/Entitlements.h"
-#include "platform/Limits.h"
-#include "platform/LineLimits.h"
-#include "platform/Log.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Limits.h"
+#include "platform/queues/LineLimits.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 

@@ -18,17 +18,17 @@
 #include <string>
 #include <vector>
 
-#include "platform/Counters.h"
-#include "platform/Mutex.h"
 #include "platform/Reactor.h"
-#include "platform/SerialQueue.h"
-#include "platform/Timer.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/UserBudget.h"
 #include "platform/ipc/ConnectionOutput.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/Listener.h"
 #include "platform/ipc/MessageReader.h"
 #include "platform/ipc/ServerContext.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

@@ -2,10 +2,10 @@
 #include <cstring>
 #include <utility>
 
-#include "platform/Clock.h"
-#include "platform/Limits.h"
-#include "platform/LineLimits.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Limits.h"
 #include "platform/ipc/DBusConnection.h"
+#include "platform/queues/LineLimits.h"
 
 namespace kyt {
 namespace {

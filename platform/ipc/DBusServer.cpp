@@ -3,12 +3,12 @@
 #include <atomic>
 #include <utility>
 
-#include "platform/Clock.h"
-#include "platform/Counters.h"
-#include "platform/Log.h"
-#include "platform/SerialQueue.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/UserBudget.h"
 #include "platform/ipc/DBusConnection.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 namespace {

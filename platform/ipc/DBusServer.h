@@ -10,12 +10,12 @@
 #include <cstddef>
 #include <memory>
 
-#include "platform/Mutex.h"
 #include "platform/Reactor.h"
 #include "platform/Stream.h"
-#include "platform/Timer.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/Listener.h"
 #include "platform/ipc/ServerContext.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

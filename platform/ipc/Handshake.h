@@ -14,7 +14,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 
 namespace kyt {
 

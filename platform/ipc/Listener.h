@@ -7,9 +7,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Function.h"
-#include "platform/Value.h"
+#include "platform/base/Function.h"
 #include "platform/ipc/ClientSessionInterface.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -3,7 +3,7 @@
 #include <bit>
 #include <cstring>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 #include "platform/ipc/WireText.h"
 
 namespace kyt {

@@ -17,9 +17,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
 #include "platform/ipc/Wire.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

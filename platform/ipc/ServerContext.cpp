@@ -2,8 +2,8 @@
 
 #include <utility>
 
-#include "platform/Limits.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/ipc/DBusConnection.h"
 
 namespace kyt {

@@ -9,8 +9,8 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/Counters.h"
-#include "platform/Mutex.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/ClientSessionDispatcher.h"
 
 namespace kyt {

@@ -6,7 +6,7 @@
 #include <span>
 #include <utility>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 
 namespace kyt::wire {
 namespace {

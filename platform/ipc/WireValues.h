@@ -4,8 +4,8 @@
 
 #include <string_view>
 
-#include "platform/Value.h"
 #include "platform/ipc/WireCursor.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::wire {
 

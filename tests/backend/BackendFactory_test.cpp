@@ -3,7 +3,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

@@ -5,8 +5,8 @@
 #include <openssl/sha.h>
 
 #include "backend/Text.h"
-#include "platform/Counters.h"
-#include "platform/SerialQueue.h"
+#include "platform/base/Counters.h"
+#include "platform/queues/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

@@ -8,7 +8,7 @@
 #include "backends/https/HTTPSPostBackend.h"
 #include "backends/qdx/QDXBackend.h"
 #include "backends/upload/UploadBackend.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

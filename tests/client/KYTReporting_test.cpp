@@ -17,7 +17,7 @@
 #include <thread>
 
 #include "client/Loop.h"
-#include "platform/SessionInfoKeys.h"
+#include "platform/objects/SessionInfoKeys.h"
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"

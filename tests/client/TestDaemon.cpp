@@ -2,7 +2,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/Eventually.h"
 
 namespace kyt {

@@ -5,8 +5,8 @@
 #include <string>
 #include <thread>
 
-#include "platform/Keys.h"
 #include "platform/UserDefaults.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/SignedBag.h"
 #include "tests/support/TestPlatform.h"
 

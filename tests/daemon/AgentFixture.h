@@ -12,9 +12,9 @@
 
 #include "config/StorebagFetcher.h"
 #include "daemon/ReportingdAgent.h"
-#include "platform/Keys.h"
 #include "platform/fake/FakeProcessTransaction.h"
 #include "platform/ipc/fake/FakeListener.h"
+#include "platform/objects/Keys.h"
 #include "session/ReportingdSession.h"
 #include "session/ReportingdSessionClass.h"
 #include "tests/support/RecordingBackend.h"

@@ -1,5 +1,5 @@
 // Shared data and the health report.
-#include "platform/ObjectSize.h"
+#include "platform/objects/ObjectSize.h"
 #include "tests/daemon/AgentFixture.h"
 
 namespace kyt {

@@ -3,7 +3,7 @@
 #include <vector>
 
 #include "platform/UserDefaults.h"
-#include "platform/WorkerPool.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/daemon/AgentFixture.h"
 
 namespace kyt {

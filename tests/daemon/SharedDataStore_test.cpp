@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 
 namespace kyt {
 namespace {

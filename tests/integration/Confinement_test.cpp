@@ -13,7 +13,7 @@
 #include <utility>
 
 #include "platform/linux/base/Descriptors.h"
-#include "platform/linux/system/LinuxConfinement.h"
+#include "platform/linux/confinement/LinuxConfinement.h"
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/StageFixture.h"
 #include "tests/support/OldKernel.h"

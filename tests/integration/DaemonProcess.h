@@ -20,8 +20,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Value.h"
-#include "platform/linux/PugixmlPropertyLists.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/objects/Value.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/SignedBag.h"
 #include "tests/support/TemporaryFolder.h"

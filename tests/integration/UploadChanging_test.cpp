@@ -1,6 +1,6 @@
 // Files that their clients go on writing, or cut, while the daemon reads and sends them: what arrives is a request
 // whose length is right, whole in itself, with bytes that were in the file. The exact moments are chosen in
-// tests/linux/system/LinuxFileExtensions_test.cpp; here a writer does not stop.
+// tests/linux/helpers/LinuxFileExtensions_test.cpp; here a writer does not stop.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>

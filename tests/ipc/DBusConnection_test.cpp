@@ -5,15 +5,15 @@
 
 #include "WireTestSupport.h"
 #include "platform/Entitlements.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/WorkerPool.h"
+#include "platform/base/Limits.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/fake/ManualTimers.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/fake/MemoryStream.h"
 #include "platform/ipc/DBusServer.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

@@ -8,12 +8,12 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
 #include "platform/fake/FakeFileManager.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 namespace {

@@ -1,8 +1,8 @@
 // The life and configuration of a session.
 #include "session/ReportingdSession.h"
 
-#include "platform/Base64.h"
 #include "platform/UserDefaults.h"
+#include "platform/objects/Base64.h"
 #include "tests/session/SessionFixture.h"
 
 namespace kyt {

@@ -12,8 +12,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Keys.h"
 #include "platform/ipc/fake/FakeListener.h"
+#include "platform/objects/Keys.h"
 #include "session/ReportingdSession.h"
 #include "session/ReportingdSessionClass.h"
 #include "session/ReportingdSessionDelegate.h"

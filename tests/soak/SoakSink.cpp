@@ -23,7 +23,7 @@
 #include "devserver/Files.h"
 #include "devserver/Gzip.h"
 #include "devserver/HttpServer.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt::devserver {
 namespace {

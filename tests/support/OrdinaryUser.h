@@ -11,7 +11,7 @@
 #include <fstream>
 #include <string>
 
-#include "platform/linux/system/Capabilities.h"
+#include "platform/linux/confinement/Capabilities.h"
 
 namespace kyt {
 

@@ -13,7 +13,7 @@
 
 #include "backend/BackendFactory.h"
 #include "backend/KYTReportingBackend.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

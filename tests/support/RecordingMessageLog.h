@@ -4,9 +4,9 @@
 #include <string>
 #include <vector>
 
-#include "platform/Description.h"
-#include "platform/Log.h"
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
+#include "platform/objects/Description.h"
+#include "platform/queues/Log.h"
 #include "session/MessageLog.h"
 
 namespace kyt {

@@ -8,7 +8,7 @@
 #include <memory>
 #include <vector>
 
-#include "platform/Base64.h"
+#include "platform/objects/Base64.h"
 
 namespace kyt {
 

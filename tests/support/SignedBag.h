@@ -4,7 +4,7 @@
 #include <string>
 
 #include "platform/PropertyLists.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 

@@ -6,11 +6,10 @@
 #include "config/Configuration.h"
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
 #include "platform/Platform.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/fake/FakeBundle.h"
 #include "platform/fake/FakeConsent.h"
 #include "platform/fake/FakeDeviceProperties.h"
@@ -18,7 +17,7 @@
 #include "platform/fake/FakePluginBundles.h"
 #include "platform/fake/FakePowerLog.h"
 #include "platform/fake/FakeUDPSocket.h"
-#include "platform/fake/FakeUrlSession.h"
+#include "platform/fake/FakeURLSession.h"
 #include "platform/fake/FakeUserDefaults.h"
 #include "platform/fake/FaultyDeflate.h"
 #include "platform/fake/FixedRandom.h"
@@ -27,11 +26,12 @@
 #include "platform/fake/ManualTimers.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/fake/MemoryStream.h"
-#include "platform/linux/LinuxMemoryInfo.h"
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
-#include "platform/linux/ZlibDeflate.h"
+#include "platform/linux/data/LinuxMemoryInfo.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/linux/data/RapidJSON.h"
+#include "platform/linux/data/ZlibDeflate.h"
+#include "platform/queues/Log.h"
 
 namespace kyt {
 
@@ -51,7 +51,7 @@ struct TestPlatform {
   FakeConsent consent;
   OpenSSLCryptography cryptography;
   PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
+  RapidJSON json;
   ZlibDeflate zlib;
   FaultyDeflate deflate{&zlib};
   LinuxMemoryInfo memory;

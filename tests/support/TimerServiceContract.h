@@ -11,9 +11,9 @@
 #include <optional>
 #include <vector>
 
-#include "platform/Clock.h"
-#include "platform/SerialQueue.h"
-#include "platform/Timer.h"
+#include "platform/base/Clock.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

@@ -3,10 +3,10 @@
 
 #include <cstdlib>
 
-#include "platform/linux/system/ConfinementProfile.h"
-#include "platform/linux/system/FlatToml.h"
-#include "platform/linux/system/TomlEntitlements.h"
-#include "platform/linux/system/TomlSettings.h"
+#include "platform/linux/confinement/ConfinementProfile.h"
+#include "platform/linux/entitlements/TomlEntitlements.h"
+#include "platform/linux/toml/FlatToml.h"
+#include "platform/linux/toml/TomlSettings.h"
 #include "tests/integration/StageFixture.h"
 #include "tests/tools/ManualText.h"
 

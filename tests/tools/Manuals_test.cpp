@@ -3,8 +3,8 @@
 
 #include <filesystem>
 
-#include "platform/Counters.h"
-#include "platform/linux/system/TomlSettings.h"
+#include "platform/base/Counters.h"
+#include "platform/linux/toml/TomlSettings.h"
 #include "tests/tools/ManualText.h"
 
 namespace kyt {

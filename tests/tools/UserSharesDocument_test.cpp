@@ -4,8 +4,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Limits.h"
-#include "platform/UserBudget.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "tests/tools/ManualText.h"
 
 namespace kyt {

@@ -5,8 +5,8 @@
 #include <map>
 
 #include "platform/Cryptography.h"
-#include "platform/TextEscape.h"
-#include "platform/linux/OpenSSLCryptography.h"
+#include "platform/base/TextEscape.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
 #include "tools/demo/DemoBag.h"
 #include "tools/demo/Stage.h"
 

@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::tools {
 

@@ -10,9 +10,9 @@
 #include <cstring>
 #include <filesystem>
 
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/linux/data/RapidJSON.h"
 #include "tools/StorebagFile.h"
 #include "tools/demo/Http.h"
 
@@ -43,7 +43,7 @@ std::string grantFor(uid_t user) {
 }
 
 Value parsedJSON(const std::string& text) {
-  RapidJSONWriter json;
+  RapidJSON json;
   auto parsed = json.parse(text);
   return std::holds_alternative<Value>(parsed) ? std::get<Value>(std::move(parsed)) : Value();
 }
@@ -166,7 +166,7 @@ std::optional<Error> Stage::handOverFolders() {
 
 std::optional<Error> Stage::putStorebag(const std::string& name, const Dictionary& bag) {
   PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
+  RapidJSON json;
   OpenSSLCryptography cryptography;
   auto document = StorebagFile(propertyLists, json, cryptography).sign(bag, privateKey_);
   if (auto* error = std::get_if<Error>(&document)) return *error;

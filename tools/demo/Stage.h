@@ -11,8 +11,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
+#include "platform/objects/Value.h"
 #include "tools/demo/ChildProcess.h"
 
 namespace kyt::tools {

@@ -7,9 +7,9 @@
 #include <cstdio>
 #include <fstream>
 
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
-#include "platform/linux/system/Process.h"
+#include "platform/linux/service/Process.h"
 #include "tools/StorebagFile.h"
 #include "tools/demo/Checks.h"
 #include "tools/demo/DemoBag.h"

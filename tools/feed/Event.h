@@ -6,9 +6,9 @@
 #include <string>
 #include <variant>
 
-#include "platform/Clock.h"
 #include "platform/JSON.h"
-#include "platform/Value.h"
+#include "platform/base/Clock.h"
+#include "platform/objects/Value.h"
 
 namespace kyt::tools {
 

@@ -7,27 +7,27 @@
 
 #include "backends/dashboard/DashboardBackend.h"
 #include "platform/Bundle.h"
-#include "platform/Counters.h"
-#include "platform/Limits.h"
 #include "platform/Platform.h"
-#include "platform/UserBudget.h"
-#include "platform/WorkerPool.h"
-#include "platform/linux/LinuxMemoryInfo.h"
-#include "platform/linux/LinuxRandom.h"
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
-#include "platform/linux/ZlibDeflate.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/LinuxUDPSocket.h"
-#include "platform/linux/system/DlopenPluginBundles.h"
-#include "platform/linux/system/JournalPowerLog.h"
-#include "platform/linux/system/LinuxDeviceProperties.h"
-#include "platform/linux/system/LinuxFileExtensions.h"
-#include "platform/linux/system/LogSinks.h"
-#include "platform/linux/system/TomlUserDefaults.h"
-#include "platform/linux/url/CurlUrlSession.h"
+#include "platform/linux/data/LinuxMemoryInfo.h"
+#include "platform/linux/data/LinuxRandom.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/linux/data/RapidJSON.h"
+#include "platform/linux/data/ZlibDeflate.h"
+#include "platform/linux/device/LinuxDeviceProperties.h"
+#include "platform/linux/device/TomlUserDefaults.h"
+#include "platform/linux/helpers/LinuxFileExtensions.h"
+#include "platform/linux/plugins/DlopenPluginBundles.h"
+#include "platform/linux/service/JournalPowerLog.h"
+#include "platform/linux/service/LogSinks.h"
+#include "platform/linux/url/CurlURLSession.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt::tools {
 
@@ -52,7 +52,7 @@ struct Machine {
   LinuxMemoryInfo memory;
   OpenSSLCryptography cryptography;
   PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
+  RapidJSON json;
   ZlibDeflate deflate;
   TomlUserDefaults userDefaults{{"/nonexistent"}, log, counters, clock};
   LinuxDeviceProperties deviceProperties{DeviceSources{}, cryptography, log, clock};

@@ -10,7 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
 
 namespace kyt::tools {
 

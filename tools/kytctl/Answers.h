@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "kytreporting/KYTReporting.h"
-#include "platform/Error.h"
+#include "platform/base/Error.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Error.h"
+#include "platform/base/Error.h"
 
 namespace kyt::tools {
 

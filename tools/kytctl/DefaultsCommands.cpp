@@ -4,11 +4,11 @@
 #include <cstdio>
 #include <cstdlib>
 
-#include "platform/Counters.h"
-#include "platform/Log.h"
-#include "platform/TextEscape.h"
+#include "platform/base/Counters.h"
+#include "platform/base/TextEscape.h"
 #include "platform/linux/base/LinuxClock.h"
-#include "platform/linux/system/TomlUserDefaults.h"
+#include "platform/linux/device/TomlUserDefaults.h"
+#include "platform/queues/Log.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {

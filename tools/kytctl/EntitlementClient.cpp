@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "platform/linux/base/UnixSocket.h"
-#include "platform/linux/system/EntitlementMatch.h"
+#include "platform/linux/entitlements/EntitlementMatch.h"
 
 namespace kyt::tools {
 namespace {

@@ -7,7 +7,7 @@
 #include <variant>
 
 #include "platform/linux/base/Descriptors.h"
-#include "platform/linux/system/TomlEntitlements.h"
+#include "platform/linux/entitlements/TomlEntitlements.h"
 
 namespace kyt::tools {
 

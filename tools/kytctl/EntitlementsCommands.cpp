@@ -13,14 +13,14 @@
 #include <cstdio>
 #include <string_view>
 
-#include "platform/Counters.h"
-#include "platform/Keys.h"
-#include "platform/Log.h"
-#include "platform/TextEscape.h"
+#include "platform/base/Counters.h"
+#include "platform/base/TextEscape.h"
 #include "platform/linux/base/LinuxClock.h"
-#include "platform/linux/system/EntitlementMatch.h"
-#include "platform/linux/system/LogSinks.h"
-#include "platform/linux/system/TomlEntitlements.h"
+#include "platform/linux/entitlements/EntitlementMatch.h"
+#include "platform/linux/entitlements/TomlEntitlements.h"
+#include "platform/linux/service/LogSinks.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/EntitlementClient.h"
 

@@ -4,15 +4,15 @@
 #include <memory>
 
 #include "kytreporting/KYTReporting.h"
-#include "platform/TextEscape.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/base/TextEscape.h"
+#include "platform/linux/data/RapidJSON.h"
 #include "tools/kytctl/Answers.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {
 
 int sendCommand(const ConnectionOptions& connection, const SendOptions& given) {
-  RapidJSONWriter json;
+  RapidJSON json;
   auto payload = json.parse(given.payloadJSON);
   if (auto* error = std::get_if<Error>(&payload)) return failed("--payload: " + error->localizedDescription);
   if (!std::get<Value>(payload).isDictionary()) return failed("--payload is a JSON object");

@@ -5,7 +5,7 @@
 #include <fstream>
 #include <iostream>
 
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/linux/data/RapidJSON.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/SessionScript.h"
 
@@ -19,7 +19,7 @@ int sessionCommand(const ConnectionOptions& connection, const std::string& path)
     if (!file) return failed(path + ": " + std::strerror(errno));
   }
   std::istream& lines = path == "-" ? std::cin : file;
-  RapidJSONWriter json;
+  RapidJSON json;
   SessionScript script(connection);
   std::string line;
   for (int number = 1; std::getline(lines, line); ++number) {

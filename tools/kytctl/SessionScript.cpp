@@ -7,7 +7,7 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
 
 namespace kyt::tools {
 

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "kytreporting/KYTReporting.h"
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 #include "tools/KeyRules.h"
 #include "tools/kytctl/Answers.h"
 

@@ -7,10 +7,10 @@
 #include <cstdio>
 #include <cstring>
 
-#include "platform/TextEscape.h"
-#include "platform/linux/OpenSSLCryptography.h"
-#include "platform/linux/PugixmlPropertyLists.h"
-#include "platform/linux/RapidJSONWriter.h"
+#include "platform/base/TextEscape.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
+#include "platform/linux/data/RapidJSON.h"
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
 
@@ -20,7 +20,7 @@ namespace {
 
 struct Services {
   PugixmlPropertyLists propertyLists;
-  RapidJSONWriter json;
+  RapidJSON json;
   OpenSSLCryptography cryptography;
   StorebagFile file{propertyLists, json, cryptography};
 };

@@ -34,10 +34,10 @@
 #include <string>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Function.h"
-#include "platform/Keys.h"
-#include "platform/Value.h"
+#include "platform/base/Error.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Keys.h"
+#include "platform/objects/Value.h"
 
 #if defined(__GNUC__)
 #define KYT_EXPORT __attribute__((visibility("default")))

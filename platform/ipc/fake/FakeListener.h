@@ -10,9 +10,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Mutex.h"
-#include "platform/SerialQueue.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/Listener.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 

@@ -5,8 +5,8 @@
 
 #include <algorithm>
 
-#include "platform/WorkerPool.h"
 #include "platform/linux/base/Descriptors.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

@@ -1,7 +1,7 @@
 // Owning descriptors and making small ones. A Descriptor made here closes with close(2).
 #pragma once
 
-#include "platform/Descriptor.h"
+#include "platform/base/Descriptor.h"
 
 namespace kyt {
 

@@ -22,12 +22,12 @@
 #include <utility>
 #include <vector>
 
-#include "platform/ConditionVariable.h"
-#include "platform/Mutex.h"
-#include "platform/SerialQueue.h"
-#include "platform/WorkerPool.h"
+#include "platform/base/ConditionVariable.h"
+#include "platform/base/Mutex.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/LeaderThreads.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

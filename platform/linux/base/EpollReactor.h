@@ -16,7 +16,7 @@
 #include <memory>
 
 #include "platform/Reactor.h"
-#include "platform/Timer.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 

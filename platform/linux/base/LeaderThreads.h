@@ -17,9 +17,9 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Clock.h"
-#include "platform/ConditionVariable.h"
-#include "platform/Mutex.h"
+#include "platform/base/Clock.h"
+#include "platform/base/ConditionVariable.h"
+#include "platform/base/Mutex.h"
 
 namespace kyt {
 

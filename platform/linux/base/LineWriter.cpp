@@ -13,8 +13,8 @@
 #include <thread>
 #include <utility>
 
-#include "platform/ConditionVariable.h"
-#include "platform/Mutex.h"
+#include "platform/base/ConditionVariable.h"
+#include "platform/base/Mutex.h"
 #include "platform/linux/base/Threads.h"
 
 namespace kyt {

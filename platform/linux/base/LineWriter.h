@@ -8,7 +8,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/Clock.h"
+#include "platform/base/Clock.h"
 
 namespace kyt {
 

@@ -1,7 +1,7 @@
 // The system's clocks.
 #pragma once
 
-#include "platform/Clock.h"
+#include "platform/base/Clock.h"
 
 namespace kyt {
 

@@ -7,7 +7,7 @@
 
 #include <chrono>
 
-#include "platform/Descriptor.h"
+#include "platform/base/Descriptor.h"
 
 namespace kyt {
 

@@ -7,8 +7,8 @@
 #include <string>
 #include <variant>
 
-#include "platform/Error.h"
 #include "platform/Stream.h"
+#include "platform/base/Error.h"
 #include "platform/linux/base/DescriptorRoom.h"
 
 namespace kyt {

@@ -3,7 +3,7 @@
 #include <cstdio>
 #include <string>
 
-#include "platform/TextEscape.h"
+#include "platform/base/TextEscape.h"
 
 namespace kyt {
 

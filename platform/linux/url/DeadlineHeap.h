@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Clock.h"
+#include "platform/base/Clock.h"
 
 namespace kyt {
 

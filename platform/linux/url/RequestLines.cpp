@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/linux/url/UrlTransfer.h"
+#include "platform/linux/url/URLTransfer.h"
 
 namespace kyt {
 

@@ -7,7 +7,7 @@
 #include <optional>
 #include <utility>
 
-#include "platform/linux/url/UrlConnection.h"
+#include "platform/linux/url/URLConnection.h"
 
 namespace kyt {
 namespace {

@@ -3,7 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "backends/ampyx/AmpyxBackend.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/DocumentBlock.h"
 #include "tests/support/TestPlatform.h"
 

@@ -1,9 +1,9 @@
 // The upload of log data.
 #include <thread>
 
-#include "platform/KeyedArchive.h"
-#include "platform/Limits.h"
-#include "platform/Semaphore.h"
+#include "platform/base/Limits.h"
+#include "platform/objects/KeyedArchive.h"
+#include "platform/queues/Semaphore.h"
 #include "tests/backends/dashboard/DashboardFixture.h"
 
 namespace kyt {

@@ -12,10 +12,10 @@
 #include <vector>
 
 #include "backends/dashboard/DashboardBackend.h"
-#include "platform/Keys.h"
-#include "platform/WorkerPool.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxUDPSocket.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 #include "tests/support/UDPPeer.h"

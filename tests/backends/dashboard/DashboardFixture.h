@@ -12,7 +12,7 @@
 #include <vector>
 
 #include "backends/dashboard/DashboardBackend.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

@@ -3,7 +3,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "platform/KeyedArchive.h"
+#include "platform/objects/KeyedArchive.h"
 #include "tests/backends/dashboard/DashboardFixture.h"
 
 namespace kyt {

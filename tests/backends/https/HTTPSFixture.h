@@ -10,8 +10,8 @@
 #include <vector>
 
 #include "backends/https/HTTPSPostBackend.h"
-#include "platform/Keys.h"
-#include "platform/SerialQueue.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

@@ -1,5 +1,5 @@
 // The road of one event by state and flag, the batch and its flush.
-#include "platform/ObjectSize.h"
+#include "platform/objects/ObjectSize.h"
 #include "tests/backends/https/HTTPSFixture.h"
 
 namespace kyt {

@@ -5,7 +5,7 @@
 #include <deque>
 #include <thread>
 
-#include "platform/Mutex.h"
+#include "platform/base/Mutex.h"
 #include "tests/backends/https/HTTPSFixture.h"
 
 namespace kyt {

@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {

@@ -12,9 +12,9 @@
 #include <thread>
 #include <utility>
 
-#include "platform/Keys.h"
-#include "platform/SerialQueue.h"
-#include "platform/WorkerPool.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 

@@ -3,7 +3,7 @@
 #include <zlib.h>
 
 #include "backends/upload/UploadBackend.h"
-#include "platform/Keys.h"
+#include "platform/objects/Keys.h"
 #include "tests/support/DocumentBlock.h"
 #include "tests/support/TestPlatform.h"
 

@@ -7,7 +7,7 @@
 #include <fstream>
 #include <string>
 
-#include "platform/WorkerPool.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/NoDescriptors.h"
 

@@ -18,11 +18,11 @@
 #include <system_error>
 #include <thread>
 
-#include "platform/Semaphore.h"
-#include "platform/WorkerPool.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/Threads.h"
+#include "platform/queues/Semaphore.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TimerServiceContract.h"
 

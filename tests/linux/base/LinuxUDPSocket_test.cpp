@@ -8,9 +8,9 @@
 #include <cerrno>
 #include <string>
 
-#include "platform/InternetAddress.h"
-#include "platform/Semaphore.h"
+#include "platform/base/InternetAddress.h"
 #include "platform/linux/base/EpollReactor.h"
+#include "platform/queues/Semaphore.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/UDPPeer.h"
 

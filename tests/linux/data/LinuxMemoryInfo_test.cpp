@@ -1,11 +1,11 @@
-#include "platform/linux/LinuxMemoryInfo.h"
+#include "platform/linux/data/LinuxMemoryInfo.h"
 
 #include <gtest/gtest.h>
 
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/ObjectSize.h"
+#include "platform/objects/ObjectSize.h"
 
 namespace kyt {
 namespace {

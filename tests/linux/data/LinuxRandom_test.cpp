@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxRandom.h"
+#include "platform/linux/data/LinuxRandom.h"
 
 #include <gtest/gtest.h>
 
@@ -7,7 +7,7 @@
 #include <set>
 #include <string>
 
-#include "platform/UUIDText.h"
+#include "platform/base/UUIDText.h"
 #include "platform/fake/FixedRandom.h"
 
 namespace kyt {

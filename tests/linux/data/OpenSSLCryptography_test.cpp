@@ -1,4 +1,4 @@
-#include "platform/linux/OpenSSLCryptography.h"
+#include "platform/linux/data/OpenSSLCryptography.h"
 
 #include <gtest/gtest.h>
 #include <openssl/ec.h>
@@ -10,7 +10,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Value.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 namespace {

@@ -1,11 +1,11 @@
-#include "platform/linux/PugixmlPropertyLists.h"
+#include "platform/linux/data/PugixmlPropertyLists.h"
 
 #include <gtest/gtest.h>
 
 #include <cmath>
 #include <string>
 
-#include "platform/Limits.h"
+#include "platform/base/Limits.h"
 
 namespace kyt {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/ZlibDeflate.h"
+#include "platform/linux/data/ZlibDeflate.h"
 
 #include <gtest/gtest.h>
 #include <zlib.h>

@@ -13,17 +13,17 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Counters.h"
-#include "platform/Limits.h"
-#include "platform/Log.h"
-#include "platform/Mutex.h"
-#include "platform/UserBudget.h"
-#include "platform/WorkerPool.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/UserBudget.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/UnixSocket.h"
+#include "platform/queues/Log.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/PlainClient.h"
 

@@ -5,7 +5,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/support/TestHTTP2Server.h"
 
 namespace kyt {

@@ -13,7 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/support/Sanitizers.h"
 #include "tests/support/TestCertificates.h"
 

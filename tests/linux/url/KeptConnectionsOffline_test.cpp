@@ -10,7 +10,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/linux/url/Http2Nginx.h"
 #include "tests/support/NetworkNamespace.h"
 

@@ -10,7 +10,7 @@
 #include <map>
 #include <mutex>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/linux/url/Http2Nginx.h"
 
 namespace {

@@ -7,7 +7,7 @@
 #include <filesystem>
 #include <fstream>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/support/NetworkNamespace.h"
 
 namespace kyt {

@@ -1,7 +1,7 @@
 // A server that has an address of IPv6 and one of IPv4, of which one goes away while connections to it are kept.
 #include <curl/curl.h>
 
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/support/NetworkNamespace.h"
 
 namespace kyt {

@@ -4,11 +4,11 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Limits.h"
-#include "platform/UserBudget.h"
-#include "platform/WorkerPool.h"
-#include "platform/fake/FakeUrlSession.h"
-#include "tests/linux/url/CurlUrlSessionFixture.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
+#include "platform/fake/FakeURLSession.h"
+#include "platform/queues/WorkerPool.h"
+#include "tests/linux/url/CurlURLSessionFixture.h"
 
 namespace kyt {
 namespace {

@@ -1,0 +1,142 @@
+// HTTP requests. Callers: the storebag fetch (one process-wide session) and the connectivity helper of each reporting
+// session. The real one is libcurl on one network thread (platform/linux/url/CurlURLSession.h).
+//
+// start() may be called from any thread and never blocks. A completion runs exactly once, on the URL session's own
+// serial delegate queue, never on the caller's thread before start() has returned, never on the network thread.
+// A request other than GET and HEAD is sent again by itself only where the server's TCP has acknowledged not a byte of it.
+// Only http and https; TLS 1.2 or newer, always verified; no cookies, no cache. 60 s without progress is a time-out,
+// and so is an attempt that takes longer than `Limits::requestSeconds` and what its body may take; a reply body over `Limits::maxHTTPReplyBytes` is an error.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/base/Clock.h"
+#include "platform/base/Error.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Value.h"
+
+namespace kyt {
+
+class UserAccount;
+
+// The domain of transport failures; the code is libcurl's (CURLcode), or one of those below.
+inline constexpr char kKYTURLErrorDomain[] = "KYTURLErrorDomain";
+inline constexpr int32_t kURLErrorCancelled = -999;            // the session was cancelled (shut-down)
+inline constexpr int32_t kURLErrorWaitingTooMuch = -1001;      // displaced while waiting for connectivity
+inline constexpr int32_t kURLErrorOutstandingTooMuch = -1002;  // see URLSession::start
+
+struct URLRequest {
+  std::string method = "GET";
+  std::string url;
+  std::vector<std::pair<std::string, std::string>>
+      headers;  // sent in this order; control characters are removed
+  Data body;
+  std::optional<Duration> timeout;  // from start to end, progress or not; none: only the no-progress time-out
+  bool allowsCellularAccess = true;
+  bool isAwaited =
+      false;  // a thread does nothing else until it completes; see URLSessionFactory::cancelAwaited
+  std::shared_ptr<UserAccount> account;  // of the client's user; null: the daemon's own request
+  int maxRedirects = 0;                  // followed only while they stay on https
+};
+
+struct URLResponse {
+  int status = 0;
+  std::vector<std::pair<std::string, std::string>>
+      headers;  // of the last response, in order, names as received
+  // The value of that name, compared without case; of several lines of it all values, with ", " between them.
+  [[nodiscard]] std::optional<std::string> header(std::string_view name) const;
+};
+
+// (data, response, error): with an error there is no data; there is a response when its status line had come, and of its
+// headers what had come by then. The status a server has decided on counts even if its reply breaks off.
+using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
+
+struct URLSessionConfiguration {
+  std::string sourceApplication;  // sent as X-KYT-Source-Application; empty: not sent
+  bool waitsForConnectivity =
+      false;  // a request that cannot leave (no route, no resolver) waits for the network
+};
+
+// What the requests of one session that have not completed count, for those who implement the port: each user's apart,
+// towards Share::requestBytes and towards what the user may hold in all. Any thread.
+class OutstandingBytes {
+ public:
+  class User {
+   public:
+    explicit User(std::shared_ptr<UserAccount> account) : account_(std::move(account)) {}
+    // Whether there was room; then it counts until it is given back.
+    [[nodiscard]] bool take(size_t bytes);
+    void giveBack(size_t bytes);
+    // A reply's body, towards what the user may hold in all alone.
+    [[nodiscard]] bool takeReply(size_t bytes);
+    void giveReplyBack(size_t bytes);
+    // The most that may wait for a network.
+    [[nodiscard]] size_t mostWaiting() const;
+
+   private:
+    friend class OutstandingBytes;
+    [[nodiscard]] size_t most() const;
+    const std::shared_ptr<UserAccount> account_;
+    std::atomic<size_t> bytes_{0};
+    User* next_ = nullptr;
+  };
+
+  OutstandingBytes() = default;
+  ~OutstandingBytes();
+  OutstandingBytes(const OutstandingBytes&) = delete;
+  OutstandingBytes& operator=(const OutstandingBytes&) = delete;
+  // The same one each time; it lives as long as this. Mostly there is one: most sessions serve one client.
+  [[nodiscard]] User& user(const std::shared_ptr<UserAccount>& account);
+  // Header lines, body, and what keeping any request costs. One counts at most half of the limit, so that a large
+  // upload, which has a limit of its own, neither fails for its size nor shuts out what is posted meanwhile.
+  [[nodiscard]] static size_t of(const URLRequest& request);
+
+ private:
+  std::atomic<User*> first_{nullptr};
+};
+
+// A handle to a request that was started; dropping it changes nothing.
+class URLTask {
+ public:
+  virtual ~URLTask() = default;
+  virtual void cancel() = 0;  // its completion gets kURLErrorCancelled unless it has run
+};
+
+// One connection pool. Destroying it is finishTasksAndInvalidate().
+class URLSession {
+ public:
+  virtual ~URLSession() = default;
+  // A request that would make what its user has outstanding in this session count more than
+  // `Limits::maxOutstandingBytes`, or more than its user has room for, fails at once with kURLErrorOutstandingTooMuch;
+  // those before it, and other users', go on.
+  virtual std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) = 0;
+  // Requests already started still complete and call their completions; later ones fail with kURLErrorCancelled.
+  virtual void finishTasksAndInvalidate() = 0;
+};
+
+struct URLFigures {
+  uint64_t started = 0, completed = 0, failed = 0, waiting = 0, waitingBytes = 0, droppedWhileWaiting = 0,
+           refused = 0;  // too much was outstanding; they count as failed too
+};
+
+class URLSessionFactory {
+ public:
+  virtual ~URLSessionFactory() = default;
+  [[nodiscard]] virtual std::unique_ptr<URLSession> create(URLSessionConfiguration configuration) = 0;
+  // Shut-down, its beginning: requests that threads wait for end with kURLErrorCancelled, wherever they are on
+  // their way, and no such request can be started any more. All others go on, and new ones can be started.
+  virtual void cancelAwaited() = 0;
+  // Shut-down, its end: every request of every session ends with kURLErrorCancelled, and none can be started any more.
+  virtual void cancelAll() = 0;
+  [[nodiscard]] virtual URLFigures figures() const = 0;
+  // Requests not completed yet; the daemon's shut-down waits for zero.
+  [[nodiscard]] virtual size_t outstanding() const = 0;
+};
+
+}  // namespace kyt

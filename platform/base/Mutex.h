@@ -1,0 +1,83 @@
+// The locks of this project, annotated so that clang's thread-safety analysis can check every guarded field.
+//
+// `Mutex` is for the few private, short critical sections. `Monitor` is the recursive lock tied to an object (the
+// agent's lock): who holds it may call operations that take it again. Both may be used from any thread; neither
+// performs a system call unless there is contention. The order of locks is stated in docs/THREADS.md.
+#pragma once
+
+#include <mutex>
+
+#if defined(__clang__)
+#define KYT_THREAD_ANNOTATION(x) __attribute__((x))
+#else
+#define KYT_THREAD_ANNOTATION(x)
+#endif
+
+#define CAPABILITY(x) KYT_THREAD_ANNOTATION(capability(x))
+#define SCOPED_CAPABILITY KYT_THREAD_ANNOTATION(scoped_lockable)
+#define GUARDED_BY(x) KYT_THREAD_ANNOTATION(guarded_by(x))
+#define PT_GUARDED_BY(x) KYT_THREAD_ANNOTATION(pt_guarded_by(x))
+#define REQUIRES(...) KYT_THREAD_ANNOTATION(requires_capability(__VA_ARGS__))
+#define EXCLUDES(...) KYT_THREAD_ANNOTATION(locks_excluded(__VA_ARGS__))
+#define ACQUIRE(...) KYT_THREAD_ANNOTATION(acquire_capability(__VA_ARGS__))
+#define RELEASE(...) KYT_THREAD_ANNOTATION(release_capability(__VA_ARGS__))
+#define TRY_ACQUIRE(...) KYT_THREAD_ANNOTATION(try_acquire_capability(__VA_ARGS__))
+#define ASSERT_CAPABILITY(x) KYT_THREAD_ANNOTATION(assert_capability(x))
+#define RETURN_CAPABILITY(x) KYT_THREAD_ANNOTATION(lock_returned(x))
+#define NO_THREAD_SAFETY_ANALYSIS KYT_THREAD_ANNOTATION(no_thread_safety_analysis)
+
+namespace kyt {
+
+class CAPABILITY("mutex") Mutex {
+ public:
+  Mutex() = default;
+  Mutex(const Mutex&) = delete;
+  Mutex& operator=(const Mutex&) = delete;
+  void lock() ACQUIRE() { mutex_.lock(); }
+  void unlock() RELEASE() { mutex_.unlock(); }
+  [[nodiscard]] bool tryLock() TRY_ACQUIRE(true) { return mutex_.try_lock(); }
+  // For std::condition_variable_any-free waiting: ConditionVariable (ConditionVariable.h) uses it.
+  std::mutex& native() { return mutex_; }
+
+ private:
+  std::mutex mutex_;
+};
+
+class SCOPED_CAPABILITY MutexLock {
+ public:
+  explicit MutexLock(Mutex& mutex) ACQUIRE(mutex) : mutex_(mutex) { mutex_.lock(); }
+  ~MutexLock() RELEASE() { mutex_.unlock(); }
+  MutexLock(const MutexLock&) = delete;
+  MutexLock& operator=(const MutexLock&) = delete;
+
+ private:
+  Mutex& mutex_;
+};
+
+// A recursive lock that announces a contended wait to the worker pool (a storebag download may hold the agent's
+// monitor for seconds; the pool keeps other sessions running meanwhile). lock() is defined in WorkerPool.cpp.
+class CAPABILITY("monitor") Monitor {
+ public:
+  Monitor() = default;
+  Monitor(const Monitor&) = delete;
+  Monitor& operator=(const Monitor&) = delete;
+  void lock() ACQUIRE();
+  void unlock() RELEASE() { mutex_.unlock(); }
+  [[nodiscard]] bool tryLock() TRY_ACQUIRE(true) { return mutex_.try_lock(); }
+
+ private:
+  std::recursive_mutex mutex_;
+};
+
+class SCOPED_CAPABILITY MonitorLock {
+ public:
+  explicit MonitorLock(Monitor& monitor) ACQUIRE(monitor) : monitor_(monitor) { monitor_.lock(); }
+  ~MonitorLock() RELEASE() { monitor_.unlock(); }
+  MonitorLock(const MonitorLock&) = delete;
+  MonitorLock& operator=(const MonitorLock&) = delete;
+
+ private:
+  Monitor& monitor_;
+};
+
+}  // namespace kyt

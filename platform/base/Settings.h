@@ -1,0 +1,26 @@
+// The deployment settings, as read from kytreportingd.toml (platform/linux/toml/TomlSettings.h) once at
+// start-up. Constant afterwards; the composition root owns them and hands the parts down.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "platform/base/Limits.h"
+
+namespace kyt {
+
+enum class LogTarget { automatic, journal, standardError };
+
+struct Settings {
+  // Storebag hosts as addresses without a trailing slash ("https://bags.example.org"); the paths are
+  // appended.
+  std::string storebagInternalHost;
+  std::string storebagPublicHost;
+  std::string caFile;                           // PEM; empty: the system's
+  std::vector<std::string> cellularInterfaces;  // glob patterns of interface names
+  Limits limits;
+  LogTarget logTarget = LogTarget::automatic;
+  friend bool operator==(const Settings&, const Settings&) = default;
+};
+
+}  // namespace kyt

@@ -1,0 +1,137 @@
+#include "platform/base/TextEscape.h"
+
+#include <algorithm>
+#include <cstdint>
+
+namespace kyt {
+namespace {
+
+uint8_t byteAt(std::string_view text, size_t index) {
+  return static_cast<uint8_t>(text[index]);
+}
+
+bool isContinuation(std::string_view text, size_t index) {
+  return index < text.size() && (byteAt(text, index) & 0xC0) == 0x80;
+}
+
+bool isPlainASCII(char c) {
+  return c >= 0x20 && c < 0x7F;
+}
+
+// Of a valid sequence of that length.
+bool mayBeShown(std::string_view sequence) {
+  if (sequence.size() == 1) return isPlainASCII(sequence[0]);
+  if (sequence.size() == 2) return !(byteAt(sequence, 0) == 0xC2 && byteAt(sequence, 1) < 0xA0);
+  if (sequence.size() == 3 && byteAt(sequence, 0) == 0xE2) {
+    const uint8_t last = byteAt(sequence, 2);
+    if (byteAt(sequence, 1) == 0x80) return last < 0xA8 || last > 0xAE;
+    if (byteAt(sequence, 1) == 0x81) return last < 0xA6 || last > 0xA9;
+  }
+  return true;
+}
+
+void appendEscapedByte(std::string& out, uint8_t byte) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  switch (byte) {
+    case '\t':
+      out += "\\t";
+      return;
+    case '\n':
+      out += "\\n";
+      return;
+    case '\r':
+      out += "\\r";
+      return;
+    default:
+      break;
+  }
+  out += "\\x";
+  out += kDigits[byte >> 4];
+  out += kDigits[byte & 15];
+}
+
+}  // namespace
+
+size_t utf8SequenceLength(std::string_view text) {
+  if (text.empty()) return 0;
+  const uint8_t first = byteAt(text, 0);
+  if (first < 0x80) return 1;
+  if (first < 0xC2 || first > 0xF4) return 0;
+  if (!isContinuation(text, 1)) return 0;
+  if (first < 0xE0) return 2;
+  const uint8_t second = byteAt(text, 1);
+  if (first == 0xE0 && second < 0xA0) return 0;  // overlong
+  if (first == 0xED && second > 0x9F) return 0;  // a surrogate
+  if (!isContinuation(text, 2)) return 0;
+  if (first < 0xF0) return 3;
+  if (first == 0xF0 && second < 0x90) return 0;  // overlong
+  if (first == 0xF4 && second > 0x8F) return 0;  // past U+10FFFF
+  return isContinuation(text, 3) ? 4 : 0;
+}
+
+bool isValidUTF8(std::string_view text) {
+  while (!text.empty()) {
+    const size_t length = utf8SequenceLength(text);
+    if (length == 0) return false;
+    text.remove_prefix(length);
+  }
+  return true;
+}
+
+void appendEscaped(std::string& out, std::string_view text) {
+  while (!text.empty()) {
+    const auto plain =
+        static_cast<size_t>(std::find_if_not(text.begin(), text.end(), isPlainASCII) - text.begin());
+    out.append(text.substr(0, plain));
+    text.remove_prefix(plain);
+    if (text.empty()) return;
+    const size_t length = std::max<size_t>(utf8SequenceLength(text), 1);
+    const std::string_view sequence = text.substr(0, length);
+    if (utf8SequenceLength(text) != 0 && mayBeShown(sequence)) {
+      out.append(sequence);
+    } else {
+      for (char c : sequence) appendEscapedByte(out, static_cast<uint8_t>(c));
+    }
+    text.remove_prefix(length);
+  }
+}
+
+std::string escapedText(std::string_view text) {
+  std::string out;
+  out.reserve(text.size() + 16);
+  appendEscaped(out, text);
+  return out;
+}
+
+size_t lengthThatFits(std::string_view text, size_t escapedBytes) {
+  size_t end = 0;
+  for (size_t used = 0; end < text.size();) {
+    const std::string_view rest = text.substr(end);
+    const size_t length = std::max<size_t>(utf8SequenceLength(rest), 1);
+    if (isPlainASCII(rest.front())) {
+      ++used;
+    } else {
+      std::string shown;
+      appendEscaped(shown, rest.substr(0, length));
+      used += shown.size();
+    }
+    if (used > escapedBytes) break;
+    end += length;
+  }
+  return end;
+}
+
+bool isPlainText(std::string_view text) {
+  if (std::all_of(text.begin(), text.end(), isPlainASCII)) return true;
+  return escapedText(text).size() == text.size();
+}
+
+std::string beginningOf(std::string_view text) {
+  constexpr size_t kShort = 12, kShown = 8;
+  if (text.size() <= kShort) return std::string(text);
+  size_t end = kShown;
+  while (end > 0 && (static_cast<unsigned char>(text[end]) & 0xC0) == 0x80) --end;  // not within a character
+  return std::string(text.substr(0, end)) + "...";
+}
+
+}  // namespace kyt

@@ -1,0 +1,50 @@
+#include "platform/linux/service/Process.h"
+
+#include <fcntl.h>
+#include <malloc.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <system_error>
+
+namespace kyt {
+
+void fillStandardDescriptors() {
+  int opened = ::open("/dev/null", O_RDWR);
+  while (opened >= 0 && opened <= STDERR_FILENO) opened = ::open("/dev/null", O_RDWR);
+  if (opened > STDERR_FILENO) ::close(opened);
+}
+
+std::string executableFolder() {
+  std::error_code error;
+  const auto program = std::filesystem::read_symlink("/proc/self/exe", error);
+  return error ? std::string() : program.parent_path().string();
+}
+
+std::string absolutePath(const std::string& path) {
+  if (path.empty()) return path;
+  std::error_code error;
+  auto absolute = std::filesystem::absolute(path, error).lexically_normal().string();
+  if (error) return path;
+  while (absolute.size() > 1 && absolute.back() == '/') absolute.pop_back();
+  return absolute;
+}
+
+std::string folderOf(const std::string& path) {
+  return std::filesystem::path(path).parent_path().string();
+}
+
+uint32_t currentUser() {
+  return ::geteuid();
+}
+
+void giveLargeBlocksBack() {
+  constexpr int kLarge = 512 << 10;
+  (void)::mallopt(M_MMAP_THRESHOLD, kLarge);
+}
+
+void giveFreeMemoryBack() {
+  (void)::malloc_trim(0);
+}
+
+}  // namespace kyt

@@ -1,0 +1,241 @@
+#include "platform/linux/url/URLConnectionPool.h"
+
+#include <strings.h>
+#include <sys/epoll.h>
+#include <unistd.h>
+
+#include "platform/base/Limits.h"
+#include "platform/linux/url/URLNetwork.h"
+#include "platform/linux/url/URLSessionState.h"
+
+namespace kyt {
+namespace {
+
+constexpr long kConnectionsPerServer = 8;
+constexpr size_t kKeptHandles = 2;  // each keeps its buffers
+
+CURLcode useCertificates(CURL*, void* context, void* connectionsOf) {
+  auto& network = *static_cast<URLNetwork*>(connectionsOf);
+  x509_store_st* store = network.certificates().store();
+  if (store == nullptr) return CURLE_SSL_CACERT_BADFILE;
+  network.curl().setCertificateStore(static_cast<ssl_ctx_st*>(context), store);
+  return CURLE_OK;
+}
+
+}  // namespace
+
+URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& session, size_t number)
+    : network_(network),
+      session_(session),
+      number_(number),
+      curl_(network.curl()),
+      multi_(curl_.multiInit()),
+      timer_(
+          network.deadlines(), [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); },
+          this),
+      idle_(
+          network.deadlines(),
+          [](void* pool) {
+            auto* idle = static_cast<URLConnectionPool*>(pool);
+            idle->network_.idlePools().remove(*idle);
+            idle->network_.closePool(idle->session_, idle->number_);
+          },
+          this) {
+  if (multi_ == nullptr) return;
+  curl_.multiSetOption(multi_, CURLMOPT_SOCKETFUNCTION, socketChanged);
+  curl_.multiSetOption(multi_, CURLMOPT_SOCKETDATA, this);
+  curl_.multiSetOption(multi_, CURLMOPT_TIMERFUNCTION, timerChanged);
+  curl_.multiSetOption(multi_, CURLMOPT_TIMERDATA, this);
+  curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
+  curl_.multiSetOption(multi_, CURLMOPT_MAXCONNECTS, kConnectionsPerServer);
+}
+
+URLConnectionPool::~URLConnectionPool() {
+  leaveIdle();
+  for (CURL* handle : idleHandles_) curl_.easyCleanup(handle);
+  if (multi_ != nullptr) curl_.multiCleanup(multi_);
+}
+
+CURL* URLConnectionPool::takeHandle() {
+  if (!idleHandles_.empty()) {
+    CURL* handle = idleHandles_.back();
+    idleHandles_.pop_back();
+    return handle;
+  }
+  CURL* handle = curl_.easyInit();
+  if (handle == nullptr) return nullptr;
+  const auto milliseconds = [](Duration duration) {
+    return static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(duration).count());
+  };
+  const auto seconds = [](Duration duration) {
+    return static_cast<long>(std::chrono::ceil<std::chrono::seconds>(duration).count());
+  };
+  const CurlURLSessionOptions& options = network_.options();
+  curl_.easySetOption(handle, CURLOPT_NOSIGNAL, 1L);
+  curl_.easySetOption(handle, CURLOPT_NOPROGRESS, 0L);
+  curl_.easySetOption(handle, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl_.easySetOption(handle, CURLOPT_REDIR_PROTOCOLS_STR, "https");
+  curl_.easySetOption(handle, CURLOPT_PROXY, "");  // nor one from the environment
+  curl_.easySetOption(handle, CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
+  curl_.easySetOption(handle, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+  curl_.easySetOption(handle, CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
+  curl_.easySetOption(handle, CURLOPT_SSL_VERIFYPEER, 1L);
+  curl_.easySetOption(handle, CURLOPT_SSL_VERIFYHOST, 2L);
+  curl_.easySetOption(handle, CURLOPT_CAINFO, nullptr);  // the store below instead
+  curl_.easySetOption(handle, CURLOPT_CAPATH, nullptr);
+  curl_.easySetOption(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
+  curl_.easySetOption(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
+  curl_.easySetOption(handle, CURLOPT_SSL_CTX_DATA, &network_);
+  curl_.easySetOption(handle, CURLOPT_BUFFERSIZE, 4096L);  // replies are small, sessions many
+  curl_.easySetOption(handle, CURLOPT_TCP_NODELAY, 1L);
+  curl_.easySetOption(
+      handle, CURLOPT_CONNECTTIMEOUT_MS,
+      std::min(milliseconds(options.noProgressTimeout), milliseconds(std::chrono::seconds(30))));
+  curl_.easySetOption(handle, CURLOPT_MAXAGE_CONN, seconds(options.idleConnectionTime));
+  curl_.easySetOption(handle, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(Limits::maxHTTPReplyBytes));
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETFUNCTION, socketClosed);
+  curl_.easySetOption(handle, CURLOPT_CLOSESOCKETDATA, this);
+  curl_.easySetOption(handle, CURLOPT_QUICK_EXIT, 1L);  // giving up a look-up of a name must not wait for it
+  return handle;
+}
+
+// A TLS session that is taken up again is not verified again, so none is once authorities have changed.
+bool URLConnectionPool::mayResume(const URLTransfer& transfer) {
+  if (strncasecmp(transfer.request.url.c_str(), "https:", 6) != 0) return true;
+  const unsigned generation = network_.certificates().generation();
+  if (!certificates_) certificates_ = generation;
+  return *certificates_ == generation;
+}
+
+CURLcode URLConnectionPool::add(URLTransfer& transfer) {
+  CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
+  if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
+  transfer.pool = this;
+  transfer.configure(handle);
+  curl_.easySetOption(handle, CURLOPT_SSL_SESSIONID_CACHE, mayResume(transfer) ? 1L : 0L);
+  if (curl_.multiAdd(multi_, handle) != CURLM_OK) {
+    transfer.pool = nullptr;
+    curl_.easyCleanup(handle);
+    return CURLE_FAILED_INIT;
+  }
+  transfer.handle = handle;
+  ++active_;
+  leaveIdle();
+  return CURLE_OK;
+}
+
+void URLConnectionPool::remove(URLTransfer& transfer) {
+  CURL* handle = std::exchange(transfer.handle, nullptr);
+  curl_.multiRemove(multi_, handle);
+  transfer.leaveConnection();
+  transfer.pool = nullptr;
+  if (idleHandles_.size() < kKeptHandles) {
+    curl_.easySetOption(handle, CURLOPT_ERRORBUFFER, nullptr);
+    curl_.easySetOption(handle, CURLOPT_HTTPHEADER, nullptr);
+    idleHandles_.push_back(handle);
+  } else {
+    curl_.easyCleanup(handle);
+  }
+  --active_;
+  closeIfIdle();
+}
+
+void URLConnectionPool::closeIfIdle() {
+  if (active_ != 0 || isRetired_) return;
+  leaveIdle();
+  const bool now = session_.invalidated.load();
+  idle_.set(now ? network_.now() : network_.now() + network_.options().idleConnectionTime);
+  if (URLConnectionPool* surplus = network_.idlePools().add(*this)) surplus->idle_.set(network_.now());
+}
+
+void URLConnectionPool::leaveIdle() {
+  idle_.cancel();
+  network_.idlePools().remove(*this);
+}
+
+void URLConnectionPool::retire() {
+  leaveIdle();
+  isRetired_ = true;
+}
+
+void URLConnectionPool::opened(int socket, std::string interface, const sockaddr_storage& peer) {
+  std::erase_if(connections_, [&](const auto& one) { return one->socket() == socket; });
+  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface), peer));
+}
+
+std::shared_ptr<URLConnection> URLConnectionPool::connectionBetween(const char* local, int localPort,
+                                                                    const char* peer, int peerPort) {
+  for (const auto& one : connections_)
+    if (one->isBetween(local, localPort, peer, peerPort)) return one;
+  return nullptr;
+}
+
+int URLConnectionPool::socketClosed(void* pool, curl_socket_t socket) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  for (const auto& one : self.connections_)
+    if (one->socket() == socket) one->closing();
+  std::erase_if(self.connections_, [&](const auto& one) { return one->socket() == socket; });
+  self.network_.sockets().closed(socket);
+  return close(socket);
+}
+
+bool URLConnectionPool::judgeConnections() {
+  bool good = true;
+  routesWhenJudged = network_.routeChanges();
+  for (const auto& one : connections_) {
+    const RouteTable::Way way = one->way(network_.routes(), number_ == 1);
+    good = good && way == RouteTable::Way::same;
+    if (!one->isConnected()) continue;  // nothing has begun on it
+    if (way != RouteTable::Way::none) {
+      one->lostSince.reset();
+    } else if (!one->lostSince) {
+      one->lostSince = network_.now();
+      for (URLTransfer* transfer : one->transfers) network_.connectionLost(*transfer);
+    }
+  }
+  return good;
+}
+
+int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  self.network_.sockets().watch(self, socket, what);
+  return 0;
+}
+
+int URLConnectionPool::timerChanged(CURLM*, long milliseconds, void* pool) {
+  auto& self = *static_cast<URLConnectionPool*>(pool);
+  if (milliseconds < 0) {
+    self.timer_.cancel();
+  } else {
+    self.timer_.set(self.network_.now() + std::chrono::milliseconds(milliseconds));
+  }
+  return 0;
+}
+
+void URLConnectionPool::timerExpired() {
+  int running = 0;
+  curl_.multiSocketAction(multi_, CURL_SOCKET_TIMEOUT, 0, &running);
+  finishEnded();
+}
+
+void URLConnectionPool::socketReady(int socket, uint32_t events) {
+  int mask = 0, running = 0;
+  if ((events & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
+  if ((events & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
+  if ((events & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
+  curl_.multiSocketAction(multi_, socket, mask, &running);
+  finishEnded();
+}
+
+void URLConnectionPool::finishEnded() {
+  int left = 0;
+  while (const CURLMsg* message = curl_.multiReadInfo(multi_, &left)) {
+    if (message->msg != CURLMSG_DONE) continue;
+    URLTransfer* transfer = nullptr;
+    const CURLcode code = message->data.result;
+    curl_.easyGetInfo(message->easy_handle, CURLINFO_PRIVATE, &transfer);
+    network_.transferEnded(*transfer, code);
+  }
+}
+
+}  // namespace kyt

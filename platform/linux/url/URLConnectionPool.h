@@ -1,0 +1,80 @@
+// The connections of one session to its servers: a libcurl multi handle with its cache of connections, run by
+// the network thread's event loop. Made at a session's first request, freed when idle. Network thread only.
+#pragma once
+
+#include <curl/curl.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/linux/url/CurlLibrary.h"
+#include "platform/linux/url/DeadlineHeap.h"
+#include "platform/linux/url/LinkedList.h"
+#include "platform/linux/url/URLConnection.h"
+
+namespace kyt {
+
+class URLNetwork;
+class URLTransfer;
+struct URLSessionState;
+
+class URLConnectionPool {
+ public:
+  URLConnectionPool(URLNetwork& network, URLSessionState& session, size_t number);
+  ~URLConnectionPool();  // precondition: no transfer is in it
+  URLConnectionPool(const URLConnectionPool&) = delete;
+  URLConnectionPool& operator=(const URLConnectionPool&) = delete;
+
+  [[nodiscard]] CURLcode add(URLTransfer& transfer);
+  void remove(URLTransfer& transfer);  // whether it has ended or not
+  void socketReady(int socket, uint32_t events);
+  // A socket for a connection of this pool to `peer`; `interface`: that it is bound to.
+  void opened(int socket, std::string interface, const sockaddr_storage& peer);
+  // The one between these addresses, or null.
+  [[nodiscard]] std::shared_ptr<URLConnection> connectionBetween(const char* local, int localPort,
+                                                                 const char* peer, int peerPort);
+  // Looks where its connections lead. Whether a new request may go on any of them: none would leave otherwise when
+  // it were made now.
+  [[nodiscard]] bool judgeConnections();
+  // No new request: it ends with its last one. Its owner is the network from then on, which takes those out of it
+  // that have not begun.
+  void retire();
+  bool isSearched = false;  // for those
+  [[nodiscard]] URLSessionState& session() { return session_; }
+  [[nodiscard]] bool isEmpty() const { return active_ == 0; }
+  uint64_t routesWhenJudged = 0;  // the number of their last change
+  // Frees itself from the event loop, soon, when nothing is in it.
+  void closeIfIdle();
+  // Among the idle ones that are kept.
+  Links<URLConnectionPool> links;
+  bool isKept = false;
+
+ private:
+  void leaveIdle();
+  static int socketClosed(void* pool, curl_socket_t socket);
+  static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
+  static int timerChanged(CURLM* multi, long milliseconds, void* pool);
+  [[nodiscard]] CURL* takeHandle();
+  [[nodiscard]] bool mayResume(const URLTransfer& transfer);
+  void timerExpired();
+  void finishEnded();
+
+  URLNetwork& network_;
+  URLSessionState& session_;
+  const size_t number_;  // in the session
+  const CurlLibrary& curl_;
+  CURLM* multi_;
+  size_t active_ = 0;
+  bool isRetired_ = false;
+  std::vector<std::shared_ptr<URLConnection>> connections_;  // some of them never come to be
+  std::optional<unsigned> certificates_;  // their generation when a server was verified first
+  std::vector<CURL*> idleHandles_;
+  Deadline timer_;  // libcurl's
+  Deadline idle_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,96 @@
+// The elastic worker pool: the threads that run serial queues.
+//
+// Several operations block by design (a storebag download, uploads, the wait for the agent's monitor while it
+// is held by a download). A worker announces that with a BlockingScope, and the pool then keeps enough others
+// running. At most `Limits::maxWorkers` threads exist; the queues of one owner occupy at most half of them;
+// work past that waits, counted. Idle workers end after a while, the last one too, so an idle daemon has no
+// wake-ups.
+//
+// The queues of one owner run in the order of their submission, and the owners take turns: whoever has made many queues
+// ready holds up his own (OwnerLines.h). A submission wakes a worker only when fewer than `runnable`
+// run and none of them is just about to look for work; a worker that takes one queue and leaves others wakes
+// the next. A worker that the system refuses to start is tried again with the next submission.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+
+#include "platform/base/Clock.h"
+#include "platform/queues/Executor.h"
+
+namespace kyt {
+
+class Counters;
+class Log;
+
+struct WorkerPoolOptions {
+  size_t runnable = 0;  // workers that may run without being blocked; 0: the number of processors, at least 2
+  size_t maxWorkers = 512;    // threads in all
+  size_t mostOfOneOwner = 0;  // of these; 0: half of them
+  Duration idleExit = std::chrono::seconds(10);
+  const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
+  void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
+  void (*whenQuiet)() = nullptr;  // called by the last worker when it ends for want of work, no lock held
+  Counters* counters = nullptr;   // Reason::workersExhausted, each time a queue must wait for a limit
+  Log* log = nullptr;             // with `counters`: a line about that, at most once a minute
+};
+
+struct WorkerPoolFigures {
+  size_t workers = 0, idle = 0, blocked = 0, waitingQueues = 0, mostWorkers = 0;
+  uint64_t wakeUps = 0;  // workers started or woken
+};
+
+class WorkerPool final : public Executor {
+ public:
+  explicit WorkerPool(WorkerPoolOptions options);
+  ~WorkerPool() override;  // shutDown()
+  void submit(std::shared_ptr<SerialQueue> queue) override;
+  [[nodiscard]] bool borrow() override;
+  void giveBack() override;
+  // From now on whoever submits does not wait for a thread that the system refuses: what is ready waits until
+  // tryAgain(), which the caller then owes, or the next submission finds one.
+  void stopInsisting();
+  void tryAgain();
+  // Takes no more work, waits for the workers to finish what runs, destroys what is pending. Not from a
+  // worker.
+  void shutDown();
+  // The same, but waits so long at most: false when some are still at it. Then neither pool nor what they use may end.
+  [[nodiscard]] bool shutDownWithin(Duration patience);
+  [[nodiscard]] WorkerPoolFigures figures() const;
+
+ private:
+  struct Worker;
+  class Implementation;
+  std::unique_ptr<Implementation> implementation_;
+};
+
+// Who is told when its thread is about to wait: a worker, so that its pool keeps others running, and the
+// reactor, so that another thread goes on waiting for events. Nested waits are told once.
+class BlockingObserver {
+ public:
+  virtual ~BlockingObserver() = default;
+  virtual void willBlock() = 0;
+  virtual void hasBlocked() = 0;
+  // Of the calling thread; null: none. Returns the former one.
+  static BlockingObserver* exchange(BlockingObserver* observer) noexcept;
+
+ private:
+  friend class BlockingScope;
+  unsigned depth_ = 0;
+};
+
+// Announces that this thread is about to wait for something that takes long. No effect on threads without an
+// observer. Before it waits, whatever this thread's turn deferred is handed to the executors.
+class BlockingScope {
+ public:
+  BlockingScope();
+  ~BlockingScope();
+  BlockingScope(const BlockingScope&) = delete;
+  BlockingScope& operator=(const BlockingScope&) = delete;
+
+ private:
+  BlockingObserver* observer_;
+};
+
+}  // namespace kyt
