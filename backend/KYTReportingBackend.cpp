@@ -3,13 +3,12 @@
 #include <algorithm>
 #include <vector>
 
+#include "backend/PersistentIdentifier.h"
 #include "backend/Text.h"
 #include "platform/Cryptography.h"
 #include "platform/Platform.h"
 #include "platform/RandomSource.h"
-#include "platform/UserDefaults.h"
 #include "platform/base/Counters.h"
-#include "platform/base/UUIDText.h"
 #include "platform/base/UserBudget.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -144,16 +143,8 @@ void KYTReportingBackend::setSamplingThreshold(Value value) {
 }
 
 String KYTReportingBackend::getPersistentIdentifierForDNU(bool respectDnu) {
-  return persistentIdentifier(respectDnu ? "uuidRespectDnu" : "uuidOverrideDnu");
-}
-
-String KYTReportingBackend::persistentIdentifier(std::string_view key, const String* made) {
-  const Value stored = platform_.userDefaults.value(kKYTReportingDefaultsDomain, key);
-  if (const String* identifier = stored.string()) return *identifier;
-  return platform_.userDefaults.stringOrStore(
-      kKYTReportingDefaultsDomain, key,
-      made != nullptr ? *made : String(uuidText(platform_.random.uuidBytes())),
-      userAccount_ ? std::optional(userAccount_->user()) : std::nullopt);
+  return persistentIdentifier(platform_, userAccount_ ? std::optional(userAccount_->user()) : std::nullopt,
+                              respectDnu ? "uuidRespectDnu" : "uuidOverrideDnu");
 }
 
 }  // namespace kyt

@@ -157,9 +157,6 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // A random identifier that stays the same on this device, created on first use: one for reports that
   // respect the user's consent, one for those that override it.
   [[nodiscard]] String getPersistentIdentifierForDNU(bool respectDnu);
-  // What is stored in the daemon's user defaults under the key; otherwise `made`, or without it a new random UUID, which
-  // is then stored.
-  [[nodiscard]] String persistentIdentifier(std::string_view key, const String* made = nullptr);
 
  private:
   Platform& platform_;

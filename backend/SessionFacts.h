@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <string>
 
 #include "platform/base/Clock.h"
 #include "platform/objects/Value.h"
@@ -29,6 +30,8 @@ struct SessionFacts {
 
   // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
   void setSelfVersion(const String& version);
+  // "." and the minor, or nothing when that is 0.
+  [[nodiscard]] std::string versionSuffix() const;
   void setStartTimestamp(const TimeValue& timestamp) { startTimeStamp = timestamp.asSeconds(); }
 };
 

@@ -1,11 +1,14 @@
 #include "backends/https/HTTPSPostBackend.h"
 
+#include "backends/https/PostReply.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Platform.h"
 #include "platform/UserDefaults.h"
 #include "platform/base/Counters.h"
+#include "platform/base/UserBudget.h"
 #include "platform/objects/Description.h"
 #include "platform/objects/Keys.h"
+#include "platform/queues/LineLimits.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -21,6 +24,37 @@ Value numberOrMinusOne(Value number) {
   return number.isNull() ? Value(-1) : number;
 }
 
+std::optional<Array> clientsOf(const Dictionary& profile) {
+  const Value* clients = profile.find("clients");
+  const Array* list = clients != nullptr ? clients->array() : nullptr;
+  return list != nullptr ? std::optional(*list) : std::nullopt;
+}
+
+std::optional<String> textEntry(const Dictionary* dictionary, const char* key) {
+  const Value* value = dictionary != nullptr ? dictionary->find(key) : nullptr;
+  const String* text = value != nullptr ? value->string() : nullptr;
+  return text != nullptr ? std::optional(*text) : std::nullopt;
+}
+
+// The addresses that the device's own settings name.
+Decision decisionOf(Platform& platform) {
+  Decision decision;
+  const Value post = platform.userDefaults.value(kKYTReportingDefaultsDomain, "httpsPostURL");
+  if (const String* url = post.string()) {
+    platform.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for postURL", url->c_str());
+    decision.postURL = *url;
+    decision.useDefaultPostURL = true;
+  }
+  const Value realtime = platform.userDefaults.value(kKYTReportingDefaultsDomain, "httpsRealtimePostURL");
+  if (const String* url = realtime.string()) {
+    platform.log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL",
+                       url->c_str());
+    decision.realtimePostURL = *url;
+    decision.useDefaultRealtimePostURL = true;
+  }
+  return decision;
+}
+
 }  // namespace
 
 std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(Configuration& configuration,
@@ -28,8 +62,7 @@ std::shared_ptr<HTTPSPostBackend> HTTPSPostBackend::initWithName(Configuration& 
                                                                  const std::optional<Dictionary>& profile,
                                                                  SharedSessionFacts facts) {
   if (!name || !profile) return nullptr;
-  const Value* clients = profile->find("clients");
-  if (clients == nullptr || !clients->isArray()) {
+  if (!clientsOf(*profile)) {
     configuration.platform.log.error("HTTPSPostBackend(initWithName): can't find the client list.");
     return nullptr;
   }
@@ -41,91 +74,112 @@ HTTPSPostBackend::HTTPSPostBackend(Making making, Configuration& configuration, 
     : KYTReportingBackend(making, configuration.platform, std::move(name), std::move(profile),
                           std::move(facts)),
       configuration_(configuration),
-      reportVersion_(formattedReportVersion()) {
-  readUserDefaults();
-  if (const Value* displayURL = this->profile().find("display_url"); displayURL != nullptr)
-    if (const String* text = displayURL->string()) setDisplayURL(*text);
-  dnuEnabled_ = platform().consent.isSubmissionAllowed();
-  uuidRespectDnu_ = getPersistentIdentifierForDNU(true);
-  uuidOverrideDnu_ = getPersistentIdentifierForDNU(false);
+      records_(configuration, sharedFacts()),
+      decision_(decisionOf(configuration.platform)),
+      device_(readDevice()),
+      rules_(configuration.platform, {this->name(), clientsOf(this->profile()), sharedFacts(),
+                                      samplingFactor(), device_.dnuEnabled}) {
+  setDisplayURL(textEntry(&this->profile(), "display_url"));
 }
 
 HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
-  giveBackToUser(batchedBytes_);
-  if (!batchedEvents_) return;
-  platform().counters.add(Reason::batchDiscarded, batchedEvents_->size());
-  tellDiscarded(batchedEvents_->size(),
-                facts().requireUserInfo && !hasUserInfo() ? "user information was promised and is missing"
-                : stateOnQueue() == kBackendStateEnabled
-                    ? "a single message was batched, since its client entry has \"expedite\" 0"
-                    : "the back end was not enabled");
+  giveBackToUser(batch_.bytes());
+  if (!batch_.exists()) return;
+  platform().counters.add(Reason::batchDiscarded, batch_.size());
+  tellDiscarded(batch_.size(), lacksUserInfo() ? "user information was promised and is missing"
+                               : stateOnQueue() == kBackendStateEnabled
+                                   ? "a single message was batched, since its client entry has \"expedite\" 0"
+                                   : "the back end was not enabled");
 }
 
-void HTTPSPostBackend::readUserDefaults() {
-  UserDefaults& defaults = platform().userDefaults;
-  const Value post = defaults.value(kKYTReportingDefaultsDomain, "httpsPostURL");
-  if (const String* url = post.string()) {
-    platform().log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for postURL", url->c_str());
-    postURL_ = *url;
-    useDefaultPostURL_ = true;
-  }
-  const Value realtime = defaults.value(kKYTReportingDefaultsDomain, "httpsRealtimePostURL");
-  if (const String* url = realtime.string()) {
-    platform().log.debug("HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL",
-                         url->c_str());
-    realtimePostURL_ = *url;
-    useDefaultRealtimePostURL_ = true;
-  }
-  forceEventLogging_ = defaults.value(kKYTReportingDefaultsDomain, "forceEventLogging").boolValue();
+HTTPSPostBackend::Device HTTPSPostBackend::readDevice() {
+  Device device;
+  device.dnuEnabled = platform().consent.isSubmissionAllowed();
+  device.uuidRespectDnu = getPersistentIdentifierForDNU(true);
+  device.uuidOverrideDnu = getPersistentIdentifierForDNU(false);
+  device.forceEventLogging =
+      platform().userDefaults.value(kKYTReportingDefaultsDomain, "forceEventLogging").boolValue();
+  return device;
 }
 
-const String* HTTPSPostBackend::userInfoText(const char* key) const {
-  const Value* value = userInfoDict() ? userInfoDict()->find(key) : nullptr;
-  return value != nullptr ? value->string() : nullptr;
+// Promised, but not there yet.
+bool HTTPSPostBackend::lacksUserInfo() const {
+  return facts().requireUserInfo && (userInfo() == nullptr || userInfo()->empty());
 }
 
-Dictionary HTTPSPostBackend::takePayload(Dictionary& message) const {
-  // The single-message door sends the bare payload.
-  if (!message.contains(kKYTReportingMessageBlobClientData)) return message;
-  Value clientData = message.take(kKYTReportingMessageBlobClientData);
-  if (Dictionary* payload = clientData.mutableDictionary()) return std::move(*payload);
-  platform().log.error("HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil");
-  return {};
+void HTTPSPostBackend::updateState() {
+  // A frozen state is not even written again: a reply may be disabling the back end at this moment.
+  if (immutable_) return;
+  setState(updateBackendState());
+}
+
+int32_t HTTPSPostBackend::updateBackendState() {
+  if (immutable_) return state();
+  const int32_t state = rules_.decide(decision_, userInfo(),
+                                      userAccount() ? std::optional(userAccount()->user()) : std::nullopt);
+  if (decision_.batchEvents) setBatchEvents(*decision_.batchEvents);
+  if (decision_.samplingThreshold) setSamplingThreshold(*decision_.samplingThreshold);
+  if (decision_.eventWhitelist) setEventWhitelist(decision_.eventWhitelist);
+  if (decision_.eventBlacklist) setEventBlacklist(decision_.eventBlacklist);
+  return state;
+}
+
+Dictionary HTTPSPostBackend::newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
+                                                     uint16_t method, uint16_t respCode, EventID) const {
+  return records_.record(std::move(payload), {timestamp, method, respCode, eventNumber()},
+                         combinedSessionIDString(), userInfo() != nullptr ? userInfo()->size() : 0);
+}
+
+void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const {
+  if (userInfo() != nullptr) event.merge(*userInfo());
+  if (frameworkData != nullptr) event.merge(*frameworkData);
+  filterEvent(event);
+}
+
+void HTTPSPostBackend::filterEvent(Dictionary& event) const {
+  EventFilters::Digest digest = [this](const String& text) { return convertIntoSHA256(text); };
+  decision_.filters.filterEvent(event, digest);
 }
 
 void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
   platform().log.debug(
       "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary");
-  payload.set("Opt", dnuType_);
+  payload.set("Opt", decision_.dnuType);
   payload.set("SamplingThreshold", numberOrMinusOne(samplingThreshold()));
-  payload.set("OverrideSampling", numberOrMinusOne(overrideSampling_));
+  payload.set("OverrideSampling", numberOrMinusOne(decision_.overrideSampling));
   payload.set("Batch", batchEvents() ? 1u : 0u);
 }
 
 Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                                     uint16_t respCode, EventID, MessageFlag flag) {
+  struct Shared {  // what other sessions may change
+    int32_t state;
+    std::optional<SessionIDPath> sessionID;
+  };
   const Shared now = stateQueue().sync([this] { return Shared{stateOnQueue(), combinedSessionIDOnQueue()}; });
   const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
     platform().counters.add(Reason::eventDroppedByState);
     return {};
   }
-  Dictionary payload = takePayload(message);
+  Dictionary payload = records_.takePayload(message);
   if (isSessionStop(method, respCode)) addStopEntries(payload);
   const Value* shared = message.find(kKYTReportingMessageBlobSharedData);
   const Dictionary* frameworkData = shared != nullptr ? shared->dictionary() : nullptr;
   std::optional<String> sessionID;
   if (now.sessionID) sessionID = now.sessionID->text();
-  Dictionary record = makeRecord(std::move(payload), timestamp, method, respCode, sessionID,
-                                 frameworkData != nullptr ? frameworkData->size() : 0);
+  const size_t room = (frameworkData != nullptr ? frameworkData->size() : 0) +
+                      (userInfo() != nullptr ? userInfo()->size() : 0);
+  Dictionary record =
+      records_.record(std::move(payload), {timestamp, method, respCode, eventNumber()}, sessionID, room);
   prepareEventForMessage(record, frameworkData);
   // This message is deliberately still handled with the old state: it is the last of the batch that it frees.
   if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled);
   platform().log.debug("HTTPSPostBackend(sendMessage): realtime is %d", isRealtime(flag));
   const bool undecided = oldState == kBackendStateUndecided || oldState == kBackendStateHeld;
-  if (undecided || (!isRealtime(flag) && batchEvents()) || (facts().requireUserInfo && !hasUserInfo())) {
+  if (undecided || (!isRealtime(flag) && batchEvents()) || lacksUserInfo()) {
     platform().log.debug("HTTPSPostBackend(sendMessage): Batching %d, %d, %d", oldState, batchEvents(),
                          facts().requireUserInfo);
     return batchEvent(std::move(record));
@@ -137,7 +191,7 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
                                        MessageFlag flag) {
   Value flushed;
   if (state == kBackendStateEnabled && isRealtime(flag) &&
-      stateQueue().sync([this] { return batchedEvents_.has_value(); })) {
+      stateQueue().sync([this] { return batch_.exists(); })) {
     platform().log.debug(
         "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here to keep events in order.");
     flushed = flushMessagesWithCompletion(nullptr);
@@ -156,6 +210,69 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
   }
   postJSONMessage(std::move(*json), flag, method, respCode, nullptr, events);
   return text;
+}
+
+PostFacts HTTPSPostBackend::postFacts() const {
+  PostFacts post;
+  post.session = sharedFacts();
+  if (decision_.extrasOnInternal != 0 && facts().isInternal) {
+    post.clientID = facts().udid;
+  } else if (decision_.uuidCustom) {
+    post.clientID = decision_.uuidCustom;
+  } else {
+    post.clientID = decision_.dnuType != 0 ? device_.uuidOverrideDnu : device_.uuidRespectDnu;
+  }
+  post.clientName = textEntry(userInfo(), kKYTReportingUserInfoClientName);
+  post.serviceName = textEntry(userInfo(), kKYTReportingUserInfoServiceName);
+  post.consentShowsText = decision_.dnuType == 0 && device_.dnuEnabled;
+  post.settingShowsText = device_.forceEventLogging;
+  post.shouldUseWiFiOnly = decision_.shouldUseWiFiOnly;
+  post.digestKey = digestKey();
+  post.digestAlgorithm = digestAlgorithm();
+  post.account = userAccount();
+  post.sizeHint = jsonSizeHint_;
+  return post;
+}
+
+std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array records,
+                                                                            Value* prettyJSONString,
+                                                                            size_t* events) {
+  PostRequest::Message message =
+      PostRequest(configuration_, postFacts()).message(std::move(records), prettyJSONString != nullptr);
+  jsonSizeHint_ = message.json.size();
+  if (events != nullptr) *events = message.events;
+  if (prettyJSONString != nullptr && !message.prettyText.isNull())
+    *prettyJSONString = std::move(message.prettyText);
+  return std::move(message.json);
+}
+
+void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
+                                       std::optional<uint16_t> responseCode, FlushCompletion completion,
+                                       size_t events) {
+  const std::optional<String>& url = isRealtime(flag) ? decision_.realtimePostURL : decision_.postURL;
+  if (!url) {
+    platform().counters.add(Reason::postWithoutURL, events);
+    if (platform().counters.mayTell(Reason::postWithoutURL, name().str() + std::to_string(facts().compType),
+                                    platform().clock.monotonic()))
+      platform().log.normal(
+          "HTTPSPostBackend(postJsonMessage): The storebag's %s has no post_url for client type %d: %zu events are lost",
+          name().c_str(), facts().compType, events);
+    if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
+    return;
+  }
+  std::optional<EventMap> eventMap;
+  if (method && responseCode) eventMap = EventMap{*method, *responseCode};
+  URLRequest request = PostRequest(configuration_, postFacts()).request(*url, std::move(json), eventMap);
+  const auto delegate = connectivityDelegate();
+  // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
+  if (delegate == nullptr) {
+    platform().counters.add(Reason::postWithoutPoster, events);
+    return;
+  }
+  std::string address = request.url.substr(0, request.url.find('?'));
+  delegate->postURLRequestWithCompletionHandler(
+      std::move(request), PostReply{weak_from_this(), platform(), name(), std::move(completion), events,
+                                    std::move(address), userAccount()});
 }
 
 }  // namespace kyt

@@ -3,9 +3,9 @@
 // entry for the client decides the state, the addresses, the filters and the limits. Made by the factory,
 // owned by one session.
 //
-// The class is told in five files: HTTPSPostBackend.cpp (its making, and the road of one event), …Record.cpp
-// (an event's record), …State.cpp (what the storebag decides), …Batch.cpp (the batch and its flush),
-// …Post.cpp (the message and its request).
+// This is the face, whose operations are a contract and therefore many; the work is done by RecordMaker (an event's
+// record), ClientRules (what the storebag decides: a Decision), EventBatch (the records that wait), PostRequest (the
+// message and its request) and PostReply (what the answer means).
 //
 // Threads: called on its session's queue. `setCorrelatedSessionID`, `batchedEventsSize` and the properties
 // that the base keeps on the state queue may be called from any thread, as other sessions and the health
@@ -14,18 +14,19 @@
 // the URL session's queue, never on the state queue.
 #pragma once
 
-#include <array>
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
 #include <utility>
-#include <vector>
 
 #include "backend/KYTReportingBackend.h"
-#include "backends/https/EventFilters.h"
+#include "backends/https/ClientRules.h"
+#include "backends/https/Decision.h"
+#include "backends/https/EventBatch.h"
+#include "backends/https/PostRequest.h"
+#include "backends/https/RecordMaker.h"
 #include "config/Configuration.h"
-#include "platform/base/Counters.h"
 
 namespace kyt {
 
@@ -57,13 +58,19 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const;
 
   // Whether "post_url" was taken from this client entry.
-  bool updatePostLink(const Dictionary& client);
+  bool updatePostLink(const Dictionary& client) { return rules_.updatePostLink(decision_, client); }
   [[nodiscard]] bool matchClientNameAndServiceID(const Dictionary& client, const String* clientName,
-                                                 const String* serviceID) const;
-  void resetBackendStateWithClient(const Dictionary* client);
-  [[nodiscard]] bool isFrameworkEnabledForClient(const Dictionary& client) const;
+                                                 const String* serviceID) const {
+    return ClientRules::matchClientNameAndServiceID(client, clientName, serviceID);
+  }
+  void resetBackendStateWithClient(const Dictionary* client) {
+    rules_.resetBackendStateWithClient(decision_, client);
+  }
+  [[nodiscard]] bool isFrameworkEnabledForClient(const Dictionary& client) const {
+    return rules_.isFrameworkEnabledForClient(client);
+  }
   [[nodiscard]] int32_t updateBackendState();
-  void createFiltersFromArray(const Array& filters) { filters_.createFiltersFromArray(filters); }
+  void createFiltersFromArray(const Array& filters) { decision_.filters.createFiltersFromArray(filters); }
   void filterEvent(Dictionary& event) const;
 
   // The text of a flush that the record's method forced, or nothing.
@@ -78,113 +85,54 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
                        std::optional<uint16_t> responseCode, FlushCompletion completion, size_t events = 1);
 
-  [[nodiscard]] const std::optional<String>& postURL() const { return postURL_; }
-  void setPostURL(std::optional<String> value) { postURL_ = std::move(value); }
-  [[nodiscard]] const std::optional<String>& realtimePostURL() const { return realtimePostURL_; }
-  [[nodiscard]] int32_t numberOfFilters() const { return filters_.numberOfFilters(); }
-  [[nodiscard]] int32_t eventThreshold() const { return eventThreshold_; }
-  [[nodiscard]] int32_t dnuType() const { return dnuType_; }
-  [[nodiscard]] bool shouldUseWiFiOnly() const { return shouldUseWiFiOnly_; }
+  [[nodiscard]] const std::optional<String>& postURL() const { return decision_.postURL; }
+  void setPostURL(std::optional<String> value) { decision_.postURL = std::move(value); }
+  [[nodiscard]] const std::optional<String>& realtimePostURL() const { return decision_.realtimePostURL; }
+  [[nodiscard]] int32_t numberOfFilters() const { return decision_.filters.numberOfFilters(); }
+  [[nodiscard]] int32_t eventThreshold() const { return decision_.eventThreshold; }
+  [[nodiscard]] int32_t dnuType() const { return decision_.dnuType; }
+  [[nodiscard]] bool shouldUseWiFiOnly() const { return decision_.shouldUseWiFiOnly; }
   [[nodiscard]] bool immutable() const { return immutable_; }
 
  private:
   enum class BatchTaking { nothing, discarded, userInfoMissing, taken };
-  struct Shared {  // what other sessions may change
-    int32_t state = kBackendStateUndecided;
-    std::optional<SessionIDPath> sessionID;
-  };
-  struct Client {  // what the user information calls the client, null where it does not
-    const String* name = nullptr;
-    const String* service = nullptr;
+  struct Device {             // what the device says when the back end is made
+    bool dnuEnabled = false;  // the user's consent to diagnostics-and-usage upload
+    bool forceEventLogging = false;
+    String uuidRespectDnu, uuidOverrideDnu;
   };
 
-  void readUserDefaults();
-  [[nodiscard]] bool hasUserInfo() const { return userInfoDict() && !userInfoDict()->empty(); }
-  [[nodiscard]] const String* userInfoText(const char* key) const;
-
-  // The road of one event.
-  [[nodiscard]] Dictionary takePayload(Dictionary& message) const;
-  // `room` is how many more entries the caller is going to merge.
-  [[nodiscard]] Dictionary makeRecord(Dictionary payload, const TimeValue& timestamp, uint16_t method,
-                                      uint16_t respCode, const std::optional<String>& sessionID,
-                                      size_t room) const;
+  [[nodiscard]] Device readDevice();
+  [[nodiscard]] const Dictionary* userInfo() const { return userInfoDict() ? &*userInfoDict() : nullptr; }
+  [[nodiscard]] bool lacksUserInfo() const;
   void addStopEntries(Dictionary& payload) const;
   Value sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                        MessageFlag flag);
 
-  // The decision.
-  void applyExpedite(const Array& clients, const Client& client);
-  [[nodiscard]] int32_t enableWithoutUserInfo(const Array& clients);
-  [[nodiscard]] const Dictionary* chosenEntry(const Array& clients, const Client& client) const;
-  // Whether consent, country, device and filters let the chosen entry report.
-  [[nodiscard]] bool passesRules(const Dictionary& entry, const String* country);
-  [[nodiscard]] bool passesConsent(const Dictionary& entry);
-  [[nodiscard]] bool passesLists(const Dictionary& entry, const String* country) const;
-  void tellDiscarded(size_t events, const char* why) const;
-  [[nodiscard]] int32_t decideBySampling(const Dictionary& entry, const String* country);
-  void tellWhyNot(Reason reason, const char* why) const;
-  void takeSettings(const Dictionary& entry, const Client& client, int32_t state);
-  [[nodiscard]] String getPersistentIdentifierForCustomClientIDSuffix(const Client& client);
-
-  // The batch. Those that say so run on the state queue.
-  [[nodiscard]] int32_t countOnQueue(int32_t method) const;
-  void forgetSizesOnQueue();
-  void appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes);
-  void countDroppedByLimit() const;
-  void writeSessionIDOnQueue();
-  [[nodiscard]] bool takeFromUser(uint64_t bytes) const;
+  // The batch.
+  [[nodiscard]] bool hasRoomFor(uint64_t batched, uint64_t bytes) const;
   void giveBackToUser(uint64_t bytes) const;
+  void countDroppedByLimit() const;
   void countDroppedByUser() const;
-  [[nodiscard]] BatchTaking takeBatchOnQueue(Array& records, uint64_t& bytes);
+  [[nodiscard]] BatchTaking takeBatchOnQueue(EventBatch::Taken& batch);
+  void tellDiscarded(size_t events, const char* why) const;
   [[nodiscard]] bool admits(const Dictionary& record) const;
-  [[nodiscard]] Array recordsToPost(Array batch, uint64_t bytes) const;
+  [[nodiscard]] Array recordsToPost(EventBatch::Taken batch) const;
 
-  // The message and its request.
-  void removeUnpostable(Dictionary& record) const;
-  [[nodiscard]] std::optional<String> clientID() const;
-  [[nodiscard]] bool mayShowPrettyText() const;
-  [[nodiscard]] std::string addressWithForcedScheme(const String& url) const;
-  [[nodiscard]] URLRequest newRequest(std::string url, std::string json, std::optional<uint16_t> method,
-                                      std::optional<uint16_t> responseCode) const;
-  [[nodiscard]] std::string digestOfBody(const Data& body) const;
-  [[nodiscard]] std::string versionSuffix() const;
-  [[nodiscard]] String formattedReportVersion() const;
+  [[nodiscard]] PostFacts postFacts() const;
 
   const Configuration configuration_;
-  const String reportVersion_;  // as records show it
-
-  // Constant after initWithName.
-  bool dnuEnabled_ = false;  // the user's consent to diagnostics-and-usage upload
-  bool forceEventLogging_ = false;
-  String uuidRespectDnu_;
-  String uuidOverrideDnu_;
+  const RecordMaker records_;
 
   // The session's queue.
-  std::optional<String> postURL_;
-  bool useDefaultPostURL_ = false;  // from the user defaults: the storebag does not replace it
-  std::optional<String> realtimePostURL_;
-  bool useDefaultRealtimePostURL_ = false;
-  EventFilters filters_;
-  int32_t dnuType_ =
-      0;  // 0: the entry respects the consent; 1: overrides it, consent off; 2: overrides it, consent on
-  int32_t eventThreshold_ = 49;  // records of one method in a batch; one more than that, plus one, flushes
-  int32_t extrasOnInternal_ = 0;
-  Value overrideSampling_;  // a number, or null
-  std::optional<String> uuidCustom_;
-  // The custom identifiers of this object's life by their keys: one that cannot be stored must not change.
-  std::vector<std::pair<std::string, String>> madeIdentifiers_;
-  bool shouldUseWiFiOnly_ = false;
+  Decision decision_;
+  const Device device_;
+  ClientRules rules_;
   bool immutable_ = false;   // once set, the state is no longer decided anew
   size_t jsonSizeHint_ = 0;  // size of the last message
 
   // The state queue.
-  std::optional<Array> batchedEvents_;
-  std::vector<std::pair<int32_t, int32_t>> eventMethodCounts_;  // method, records of it in the batch; sorted
-  bool batchHasOldSessionID_ = false;  // written into the records when somebody reads them
-  uint64_t batchedBytes_ = 0;          // estimate of what the batch holds; its user's account has it
-  // The size that the health report shows, of so many records at the beginning of the batch.
-  mutable size_t sizedRecords_ = 0;
-  mutable uint64_t sizeOfRecords_ = 0;
+  EventBatch batch_;
 };
 
 }  // namespace kyt

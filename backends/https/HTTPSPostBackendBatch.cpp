@@ -1,6 +1,5 @@
-// The batch and its flush. What touches the batch runs on the state queue; messages are built and completions
-// run after it has been left.
-#include <algorithm>
+// How HTTPSPostBackend batches and flushes. What touches the batch runs on the state queue; messages are built and
+// completions run after it has been left.
 #include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
@@ -10,6 +9,7 @@
 #include "platform/base/UserBudget.h"
 #include "platform/objects/Keys.h"
 #include "platform/objects/ObjectSize.h"
+#include "platform/queues/LineLimits.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -32,57 +32,48 @@ void complete(FlushCompletion& completion, Error error) {
 
 }  // namespace
 
-int32_t HTTPSPostBackend::countOnQueue(int32_t method) const {
-  const auto found = std::lower_bound(eventMethodCounts_.begin(), eventMethodCounts_.end(),
-                                      std::pair<int32_t, int32_t>{method, 0});
-  return found != eventMethodCounts_.end() && found->first == method ? found->second : 0;
-}
-
-void HTTPSPostBackend::appendOnQueue(Dictionary record, int32_t method, int32_t count, uint64_t bytes) {
-  writeSessionIDOnQueue();  // the new record has its own
-  if (!batchedEvents_) batchedEvents_.emplace();
-  batchedEvents_->append(std::move(record));
-  batchedBytes_ += bytes;
-  const auto place = std::lower_bound(eventMethodCounts_.begin(), eventMethodCounts_.end(),
-                                      std::pair<int32_t, int32_t>{method, 0});
-  if (place != eventMethodCounts_.end() && place->first == method) {
-    place->second = count;
-  } else {
-    eventMethodCounts_.insert(place, {method, count});
-  }
-}
-
 Value HTTPSPostBackend::batchEvent(Dictionary record) {
   const int32_t method = methodOf(record);
   uint64_t batched = 0;
   int32_t count = stateQueue().sync([&] {
-    if (!batchedEvents_) batchedEvents_.emplace();
-    batched = batchedBytes_;
-    return countOnQueue(method);
+    batch_.begin();
+    batched = batch_.bytes();
+    return batch_.count(method);
   });
   Value flushed;
-  if (count > eventThreshold_) {
+  if (count > decision_.eventThreshold) {
     platform().log.debug(
         "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method %d",
         method);
     flushed = flushMessagesWithCompletion(nullptr);
     count = 0;
-    batched = stateQueue().sync([this] { return batchedBytes_; });  // a flush may have kept the batch
+    batched = stateQueue().sync([this] { return batch_.bytes(); });  // a flush may have kept the batch
   }
   const uint64_t bytes = roughSize(record);
-  const bool fits = batched + bytes <= platform().limits.maxBatchBytes;
-  if (!fits || !takeFromUser(bytes)) {
-    fits ? countDroppedByUser() : countDroppedByLimit();
+  if (!hasRoomFor(batched, bytes)) {
     // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
-    stateQueue().async([this] {
-      if (batchedEvents_ && batchedEvents_->empty()) batchedEvents_.reset();
-    });
+    stateQueue().async([this] { batch_.endIfEmpty(); });
     return flushed;
   }
   stateQueue().async([this, record = std::move(record), method, count, bytes]() mutable {
-    appendOnQueue(std::move(record), method, count + 1, bytes);
+    batch_.append(std::move(record), method, count + 1, bytes, combinedSessionIDOnQueue());
   });
   return flushed;
+}
+
+// Takes it from the user's account too; what has no room is counted.
+bool HTTPSPostBackend::hasRoomFor(uint64_t batched, uint64_t bytes) const {
+  if (batched + bytes > platform().limits.maxBatchBytes) {
+    countDroppedByLimit();
+    return false;
+  }
+  if (userAccount() == nullptr || userAccount()->take(Share::bytes, bytes, kLeftForMessages)) return true;
+  countDroppedByUser();
+  return false;
+}
+
+void HTTPSPostBackend::giveBackToUser(uint64_t bytes) const {
+  if (userAccount() != nullptr) userAccount()->giveBack(Share::bytes, bytes);
 }
 
 void HTTPSPostBackend::countDroppedByLimit() const {
@@ -90,14 +81,6 @@ void HTTPSPostBackend::countDroppedByLimit() const {
   platform().log.error(
       "HTTPSPostBackend(batchEvent): the batch of backend %s is full (%llu bytes), dropping events",
       name().c_str(), static_cast<unsigned long long>(platform().limits.maxBatchBytes));
-}
-
-bool HTTPSPostBackend::takeFromUser(uint64_t bytes) const {
-  return userAccount() == nullptr || userAccount()->take(Share::bytes, bytes, kLeftForMessages);
-}
-
-void HTTPSPostBackend::giveBackToUser(uint64_t bytes) const {
-  if (userAccount() != nullptr) userAccount()->giveBack(Share::bytes, bytes);
 }
 
 void HTTPSPostBackend::countDroppedByUser() const {
@@ -108,16 +91,11 @@ void HTTPSPostBackend::countDroppedByUser() const {
       name().c_str());
 }
 
-HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(Array& records, uint64_t& bytes) {
-  if (!batchedEvents_) return BatchTaking::nothing;
+HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(EventBatch::Taken& batch) {
+  if (!batch_.exists()) return BatchTaking::nothing;
   const bool enabled = stateOnQueue() == kBackendStateEnabled;
-  if (enabled && facts().requireUserInfo && !hasUserInfo()) return BatchTaking::userInfoMissing;
-  writeSessionIDOnQueue();
-  records = std::move(*batchedEvents_);
-  batchedEvents_.reset();
-  eventMethodCounts_.clear();
-  bytes = std::exchange(batchedBytes_, 0);
-  forgetSizesOnQueue();
+  if (enabled && lacksUserInfo()) return BatchTaking::userInfoMissing;
+  batch = batch_.take(combinedSessionIDOnQueue());
   return enabled ? BatchTaking::taken : BatchTaking::discarded;
 }
 
@@ -130,14 +108,13 @@ void HTTPSPostBackend::tellDiscarded(size_t events, const char* why) const {
 }
 
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
-  Array batch;
-  uint64_t bytes = 0;
-  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch, bytes); })) {
+  EventBatch::Taken batch;
+  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch); })) {
     case BatchTaking::discarded:
-      giveBackToUser(bytes);
-      platform().counters.add(Reason::batchDiscarded, batch.size());
-      if (facts().requireUserInfo && !hasUserInfo())
-        tellDiscarded(batch.size(), "user information was promised and is missing");
+      giveBackToUser(batch.bytes);
+      platform().counters.add(Reason::batchDiscarded, batch.records.size());
+      if (lacksUserInfo())
+        tellDiscarded(batch.records.size(), "user information was promised and is missing");
       [[fallthrough]];
     case BatchTaking::nothing:
       complete(completion, localError("Nothing to flush"));
@@ -149,7 +126,8 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
       break;
   }
   platform().log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
-  Array records = recordsToPost(std::move(batch), bytes);
+  const uint64_t bytes = batch.bytes;
+  Array records = recordsToPost(std::move(batch));
   Value pretty;
   std::optional<std::string> json;
   size_t events = 0;
@@ -187,26 +165,26 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
 }
 
 // The records that the lists admit, each with the user information of now, filtered, over what it had.
-// `bytes` is what the batch held. User information that came after the records makes every one of them
+// User information that came after the records makes every one of them
 // larger, and must not make of a batch within its limit a message past all bounds: then the newest are
 // dropped.
-Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
-  Dictionary userInfo;
-  if (userInfoDict()) userInfo = *userInfoDict();
-  filterEvent(userInfo);
+Array HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const {
+  Dictionary information;
+  if (userInfo() != nullptr) information = *userInfo();
+  filterEvent(information);
   const uint64_t limit = platform().limits.maxBatchBytes;
-  const bool mayOutgrow = bytes + batch.size() * roughSize(userInfo) > limit;
+  const bool mayOutgrow = batch.bytes + batch.records.size() * roughSize(information) > limit;
   uint64_t kept = 0;
   Array records;
-  records.reserve(batch.size());
-  Value* values = batch.mutableBegin();
-  for (size_t i = 0; i < batch.size(); ++i) {
+  records.reserve(batch.records.size());
+  Value* values = batch.records.mutableBegin();
+  for (size_t i = 0; i < batch.records.size(); ++i) {
     Dictionary* record = values[i].mutableDictionary();
     if (!admits(*record)) {
       platform().counters.add(Reason::batchedEventFiltered);
       continue;
     }
-    record->merge(userInfo);
+    record->merge(information);
     if (mayOutgrow && (kept += roughSize(*record)) > limit) {
       countDroppedByLimit();
       continue;
@@ -216,39 +194,16 @@ Array HTTPSPostBackend::recordsToPost(Array batch, uint64_t bytes) const {
   return records;
 }
 
-// Whoever joins a hierarchy changes the identifiers of all sessions beneath, and holds the agent's monitor
-// meanwhile: the records wait until their own session takes or adds to them.
 void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
   stateQueue().sync([&] {
     setCombinedSessionIDOnQueue(sessionID);
-    if (!batchedEvents_) return;
-    forgetSizesOnQueue();
-    batchHasOldSessionID_ = true;
+    batch_.sessionIDChanged();
   });
 }
 
-void HTTPSPostBackend::writeSessionIDOnQueue() {
-  if (!std::exchange(batchHasOldSessionID_, false) || !batchedEvents_ || !combinedSessionIDOnQueue()) return;
-  const Value sessionID(combinedSessionIDOnQueue()->text());
-  Value* values = batchedEvents_->mutableBegin();
-  for (size_t i = 0; i < batchedEvents_->size(); ++i)
-    values[i].mutableDictionary()->set("_sessionID", sessionID);
-}
-
-// The ends of other sessions ask too, so records that were sized before are not sized again.
 uint64_t HTTPSPostBackend::batchedEventsSize() {
-  return stateQueue().sync([this] {
-    writeSessionIDOnQueue();
-    const size_t count = batchedEvents_ ? batchedEvents_->size() : 0;
-    for (; sizedRecords_ < count; ++sizedRecords_)
-      sizeOfRecords_ += objectSizeEstimate((*batchedEvents_)[sizedRecords_], platform().memory);
-    return sizeOfRecords_;
-  });
-}
-
-void HTTPSPostBackend::forgetSizesOnQueue() {
-  sizedRecords_ = 0;
-  sizeOfRecords_ = 0;
+  return stateQueue().sync(
+      [this] { return batch_.sizeEstimate(combinedSessionIDOnQueue(), platform().memory); });
 }
 
 }  // namespace kyt

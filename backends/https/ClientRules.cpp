@@ -1,0 +1,320 @@
+#include "backends/https/ClientRules.h"
+
+#include <algorithm>
+
+#include "backend/KYTReportingBackend.h"
+#include "backend/PersistentIdentifier.h"
+#include "backend/Text.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Platform.h"
+#include "platform/objects/Description.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/Log.h"
+
+namespace kyt {
+
+namespace {
+
+// Clients change their name and service rarely, if ever.
+constexpr size_t kMostMadeIdentifiers = 16;
+
+// Thresholds are shown as single-precision numbers: 0.615 as 0.62.
+double asShown(const Value& threshold) {
+  return static_cast<float>(threshold.doubleValue());
+}
+
+const String* textEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->string() : nullptr;
+}
+
+const Array* arrayEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->array() : nullptr;
+}
+
+int32_t intEntry(const Dictionary& dictionary, const char* key) {
+  const Value* value = dictionary.find(key);
+  return value != nullptr ? value->intValue() : 0;
+}
+
+// A comma-separated list. An empty text is a missing list; pieces are not trimmed, and an empty one matches
+// nothing.
+Array pieces(const String* list) {
+  Array result;
+  if (list == nullptr || list->empty()) return result;
+  for (const std::string_view piece : splitText(*list, ",")) result.append(Value(piece));
+  return result;
+}
+
+// What log lines show.
+std::string shown(const String* text) {
+  return text != nullptr ? text->str() : description(Value());
+}
+std::string shown(const Array* list) {
+  return description(list != nullptr ? Value(*list) : Value());
+}
+
+// The threshold of the first element of the list whose countries hold this one; null when none does.
+const Dictionary* countrySampling(const Dictionary& entry, const String* country) {
+  const Array* thresholds = arrayEntry(entry, "per_country_sampling_thresholds");
+  if (thresholds == nullptr || country == nullptr) return nullptr;
+  for (const Value& element : *thresholds) {
+    const Dictionary* threshold = element.dictionary();
+    const Array* countries = threshold != nullptr ? arrayEntry(*threshold, "country") : nullptr;
+    if (countries != nullptr &&
+        std::find(countries->begin(), countries->end(), Value(*country)) != countries->end())
+      return threshold;
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+ClientRules::ClientRules(Platform& platform, Facts facts) : platform_(platform), facts_(std::move(facts)) {}
+
+bool ClientRules::matchClientNameAndServiceID(const Dictionary& client, const String* clientName,
+                                              const String* serviceID) {
+  const Array names = pieces(textEntry(client, "client"));
+  const Array services = pieces(textEntry(client, "service"));
+  return matchExactStringWithList(&names, clientName, true) &&
+         matchStringWithList(&services, serviceID, true);
+}
+
+bool ClientRules::isFrameworkEnabledForClient(const Dictionary& client) const {
+  const String* enabledSince = textEntry(client, "enabledSince");
+  if (enabledSince == nullptr) return true;
+  return facts_.session->selfVersion >= versionParts(*enabledSince);
+}
+
+bool ClientRules::updatePostLink(Decision& decision, const Dictionary& client) const {
+  bool taken = false;
+  if (!decision.useDefaultPostURL || !decision.postURL) {
+    decision.useDefaultPostURL = false;
+    if (const String* url = textEntry(client, "post_url")) {
+      decision.postURL = *url;
+      taken = true;
+      platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for postURL", url->c_str());
+    }
+  }
+  if (!decision.useDefaultRealtimePostURL || !decision.realtimePostURL) {
+    decision.useDefaultRealtimePostURL = false;
+    if (const String* url = textEntry(client, "realtime_post_url")) {
+      decision.realtimePostURL = *url;
+      platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for realtimePostURL",
+                          url->c_str());
+    } else {
+      decision.realtimePostURL = decision.postURL;
+      platform_.log.debug("HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '%s'",
+                          shown(decision.postURL ? &*decision.postURL : nullptr).c_str());
+    }
+  }
+  return taken;
+}
+
+void ClientRules::resetBackendStateWithClient(Decision& decision, const Dictionary* client) const {
+  decision.eventThreshold = client != nullptr ? intEntry(*client, "event_threshold") : 0;
+  platform_.log.debug("resetBackendStateWithClient: event_threshold set to %d", decision.eventThreshold);
+  decision.extrasOnInternal = client != nullptr ? intEntry(*client, "extras_on_internal") : 0;
+  platform_.log.debug("setBackendStateWithClient: extras on internal is set to %d",
+                      decision.extrasOnInternal);
+}
+
+int32_t ClientRules::decide(Decision& decision, const Dictionary* userInfo, std::optional<uint32_t> owner) {
+  decision.batchEvents.reset();
+  decision.samplingThreshold.reset();
+  decision.eventWhitelist.reset();
+  decision.eventBlacklist.reset();
+  if (!facts_.clients) return kBackendStateDisabled;
+  Client client;
+  if (userInfo != nullptr)
+    client = {textEntry(*userInfo, kKYTReportingUserInfoClientName),
+              textEntry(*userInfo, kKYTReportingUserInfoServiceName)};
+  applyExpedite(decision, client);
+  if (!facts_.session->requireUserInfo) return enableWithoutUserInfo(decision);
+  if (userInfo == nullptr || userInfo->empty()) return kBackendStateUndecided;
+  const std::optional<String> known = platform_.deviceProperties.countryCode();
+  const String* country = known ? &*known : nullptr;
+  const Dictionary* entry = chosenEntry(client);
+  if (entry == nullptr)
+    tellWhyNot(Reason::clientNotListed, client, "no entry of the storebag is for this client");
+  if (entry == nullptr || !passesRules(decision, *entry, client, country)) return kBackendStateDisabled;
+  const int32_t state = decideBySampling(decision, *entry, client, country);
+  takeSettings(decision, *entry, client, state, owner);
+  return state;
+}
+
+// Deliberately without the version gate: an entry that is too new for this version still says whether to
+// batch.
+void ClientRules::applyExpedite(Decision& decision, const Client& client) const {
+  for (const Value& element : *facts_.clients) {
+    const Dictionary* entry = element.dictionary();
+    if (entry == nullptr || !matchClientNameAndServiceID(*entry, client.name, client.service)) continue;
+    if (entry->contains("expedite")) {
+      decision.batchEvents = intEntry(*entry, "expedite") == 0;
+      platform_.log.debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d",
+                          *decision.batchEvents);
+    }
+    return;
+  }
+}
+
+// No rule about consent, country, device, filters or sampling applies to a session without user information.
+int32_t ClientRules::enableWithoutUserInfo(Decision& decision) const {
+  const Dictionary* taken = nullptr;
+  for (const Value& element : *facts_.clients) {
+    const Dictionary* entry = element.dictionary();
+    if (entry == nullptr || !updatePostLink(decision, *entry)) continue;
+    taken = entry;
+    break;
+  }
+  resetBackendStateWithClient(decision, taken);
+  return kBackendStateEnabled;
+}
+
+const Dictionary* ClientRules::chosenEntry(const Client& client) const {
+  for (const Value& element : *facts_.clients) {
+    const Dictionary* entry = element.dictionary();
+    if (entry != nullptr && matchClientNameAndServiceID(*entry, client.name, client.service) &&
+        isFrameworkEnabledForClient(*entry))
+      return entry;
+  }
+  return nullptr;
+}
+
+bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const Client& client,
+                              const String* country) const {
+  if (!passesConsent(decision, entry, client) || !passesLists(entry, client, country)) return false;
+  const Array* filters = arrayEntry(entry, "filters");
+  if (filters == nullptr) {
+    platform_.log.error("HTTPSPostBackend(updateBackendState): filters are required.");
+    return false;
+  }
+  decision.filters.createFiltersFromArray(*filters);
+  return true;
+}
+
+bool ClientRules::passesConsent(Decision& decision, const Dictionary& entry, const Client& client) const {
+  const int32_t overrideDnu = intEntry(entry, "override_dnu");
+  if (overrideDnu == 1) {
+    decision.dnuType = facts_.dnuEnabled ? 2 : 1;
+    return true;
+  }
+  decision.dnuType = 0;
+  if (facts_.dnuEnabled) return true;
+  platform_.log.debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.", overrideDnu);
+  tellWhyNot(Reason::consentMissing, client, "the user has not given consent");
+  return false;
+}
+
+bool ClientRules::passesLists(const Dictionary& entry, const Client& client, const String* country) const {
+  Log& log = platform_.log;
+  // The list is required, so it is matched by the rule that fails without one. By the same rule a device
+  // whose country is not known passes: deliberate, servers count on hearing from those.
+  const Array* locales = arrayEntry(entry, "locale_whitelist");
+  if (!matchStringWithList(locales, country, false)) {
+    if (log.debugEnabled())
+      log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
+                shown(country).c_str(), shown(locales).c_str());
+    tellWhyNot(Reason::countryNotListed, client, "the storebag's entry does not list this country");
+    return false;
+  }
+  const String* family = facts_.session->productFamily ? &*facts_.session->productFamily : nullptr;
+  const Array* devices = arrayEntry(entry, "device_whitelist");
+  if (!matchStringWithList(devices, family, true)) {
+    if (log.debugEnabled())
+      log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s",
+                shown(family).c_str(), shown(devices).c_str());
+    tellWhyNot(Reason::deviceNotListed, client, "the storebag's entry does not list this device");
+    return false;
+  }
+  const String* hardware = facts_.session->hardwareType ? &*facts_.session->hardwareType : nullptr;
+  const Array* excluded = arrayEntry(entry, "device_blacklist");
+  if (matchStringWithList(excluded, hardware, false)) {
+    if (log.debugEnabled())
+      log.debug("HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s",
+                shown(hardware).c_str(), shown(excluded).c_str());
+    tellWhyNot(Reason::deviceNotListed, client, "the storebag's entry excludes this device");
+    return false;
+  }
+  return true;
+}
+
+int32_t ClientRules::decideBySampling(Decision& decision, const Dictionary& entry, const Client& client,
+                                      const String* country) const {
+  const Value* global = entry.find("sampling_threshold");
+  Value threshold = global != nullptr ? *global : Value();
+  if (const Dictionary* forCountry = countrySampling(entry, country)) {
+    const Value* replacement = forCountry->find("threshold");
+    Value changed = replacement != nullptr ? *replacement : Value();
+    platform_.log.debug(
+        "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f",
+        country->c_str(), asShown(threshold), asShown(changed));
+    threshold = std::move(changed);
+  }
+  decision.samplingThreshold = threshold;
+  if (threshold.isNull()) {
+    tellWhyNot(Reason::samplingThresholdMissing, client, "the storebag's entry has no sampling_threshold");
+    return kBackendStateDisabled;
+  }
+  if (facts_.samplingFactor <= threshold.doubleValue()) return kBackendStateEnabled;
+  tellWhyNot(Reason::sampledOut, client, "this session was not drawn");
+  const Value* second = entry.find("override_sampling");
+  decision.overrideSampling = second != nullptr ? *second : Value();
+  // "Greater than" and no other test: an override that is not a number holds the back end.
+  if (!decision.overrideSampling.isNull() && facts_.samplingFactor > decision.overrideSampling.doubleValue())
+    return kBackendStateDisabled;
+  return kBackendStateHeld;
+}
+
+void ClientRules::takeSettings(Decision& decision, const Dictionary& entry, const Client& client,
+                               int32_t state, std::optional<uint32_t> owner) {
+  Log& log = platform_.log;
+  resetBackendStateWithClient(decision, &entry);
+  if (entry.contains("custom_clientId"))
+    decision.uuidCustom = getPersistentIdentifierForCustomClientIDSuffix(client, owner);
+  if (log.debugEnabled())
+    log.debug("HTTPSPostBackend(updateBackendState): %s: client found %s:%s, state=%d, samplingFactor=%f",
+              facts_.name.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), state,
+              facts_.samplingFactor);
+  updatePostLink(decision, entry);
+  if (const Array* list = arrayEntry(entry, "event_whitelist")) {
+    decision.eventWhitelist = *list;
+    log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@",
+                     {Value(facts_.name), Value(*list)});
+  }
+  if (const Array* list = arrayEntry(entry, "event_blacklist")) {
+    decision.eventBlacklist = *list;
+    log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@",
+                     {Value(facts_.name), Value(*list)});
+  }
+  decision.shouldUseWiFiOnly = intEntry(entry, "use_wifi_only") != 0;
+}
+
+// Each decision's own line is at the debug level; whoever runs the device sees one a minute without it.
+void ClientRules::tellWhyNot(Reason reason, const Client& client, const char* why) const {
+  if (!platform_.counters.addAndMayLog(reason, platform_.clock.monotonic())) return;
+  platform_.log.normal("HTTPSPostBackend(updateBackendState): %s posts nothing of %s:%s, since %s",
+                       facts_.name.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), why);
+}
+
+String ClientRules::getPersistentIdentifierForCustomClientIDSuffix(const Client& client,
+                                                                   std::optional<uint32_t> owner) {
+  const String empty;
+  const std::string key =
+      formatObjects("%@:%@:%@", {Value("uuid"), Value(client.name != nullptr ? *client.name : empty),
+                                 Value(client.service != nullptr ? *client.service : empty)});
+  const auto known = std::find_if(madeIdentifiers_.begin(), madeIdentifiers_.end(),
+                                  [&](const auto& made) { return made.first == key; });
+  String identifier =
+      persistentIdentifier(platform_, owner, key, known != madeIdentifiers_.end() ? &known->second : nullptr);
+  if (known == madeIdentifiers_.end()) {
+    if (madeIdentifiers_.size() >= kMostMadeIdentifiers) madeIdentifiers_.erase(madeIdentifiers_.begin());
+    madeIdentifiers_.emplace_back(key, identifier);
+  }
+  platform_.log.normal("getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s", key.c_str(),
+                       platform_.log.shownIdentifier(identifier).c_str());
+  return identifier;
+}
+
+}  // namespace kyt

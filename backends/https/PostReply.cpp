@@ -1,0 +1,53 @@
+#include "backends/https/PostReply.h"
+
+#include <cstdio>
+
+#include "platform/Platform.h"
+#include "platform/base/Clock.h"
+#include "platform/base/UserBudget.h"
+#include "platform/objects/Keys.h"
+#include "platform/queues/LineLimits.h"
+#include "platform/queues/Log.h"
+
+namespace kyt {
+
+void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> response,
+                           std::optional<Error> error) {
+  const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
+  const int status = response ? response->status : 0;
+  const bool redirected = status >= 300 && status <= 399;
+  const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
+  if (error) {
+    if (!redirected && !refused) count(Reason::requestFailed, Reason::postFailed);
+    platform.log.error("HTTPSPostBackend(postJsonMessage): post error: %s",
+                       error->localizedDescription.c_str());
+  }
+  if (redirected) tell(status, Reason::requestRedirected, Reason::postRedirected);
+  if (refused) tell(status, Reason::requestRefused, Reason::postRefused);
+  if (status >= 500 && status <= 599) error = disable(status);
+  if (completion) completion(Value(), std::move(error));
+}
+
+void PostReply::count(Reason request, Reason lost) const {
+  platform.counters.add(request);
+  platform.counters.add(lost, events);
+}
+
+// What switches the back end off has a line of its own.
+void PostReply::tell(int status, Reason request, Reason lost) const {
+  platform.counters.add(request);
+  const bool mayLog = platform.counters.addAndMayLog(lost, platform.clock.monotonic(), events);
+  if (mayLog && status < 500)
+    platform.log.normal("postJSONMessage: %s answered with status %d, %zu events of backend %s are lost",
+                        address.c_str(), status, events, name.c_str());
+}
+
+Error PostReply::disable(int status) const {
+  char text[256];
+  std::snprintf(text, sizeof text, "backend %s disabled by server %d return code", name.c_str(), status);
+  platform.log.normal("postJSONMessage: %s", text);
+  if (const auto alive = backend.lock()) alive->setState(kBackendStateDisabled);
+  return Error{kKYTReportingErrorDomain, status, text};
+}
+
+}  // namespace kyt
