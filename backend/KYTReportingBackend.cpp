@@ -65,11 +65,17 @@ void KYTReportingBackend::setReportingSessionConnectivityDelegate(
 }
 
 int32_t KYTReportingBackend::state() const {
-  return stateQueue_->sync([this] { return state_; });
+  return stateQueue_->sync([this] {
+    stateQueue_->assertCurrent();
+    return state_;
+  });
 }
 
 void KYTReportingBackend::setState(int32_t state) {
-  stateQueue_->async([this, state] { state_ = state; });
+  stateQueue_->async([this, state] {
+    stateQueue_->assertCurrent();
+    state_ = state;
+  });
 }
 
 void KYTReportingBackend::updateState() {
@@ -107,7 +113,10 @@ bool KYTReportingBackend::uploadLogData(const Value&) {
 }
 
 void KYTReportingBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
-  stateQueue_->sync([&] { combinedSessionID_ = sessionID; });
+  stateQueue_->sync([&] {
+    stateQueue_->assertCurrent();
+    combinedSessionID_ = sessionID;
+  });
 }
 
 bool KYTReportingBackend::isWhitelistedEvent(uint16_t category) const {
@@ -124,22 +133,34 @@ uint64_t KYTReportingBackend::batchedEventsSize() {
 }
 
 std::optional<String> KYTReportingBackend::combinedSessionIDString() const {
-  const std::optional<SessionIDPath> path = stateQueue_->sync([this] { return combinedSessionID_; });
+  const std::optional<SessionIDPath> path = stateQueue_->sync([this] {
+    stateQueue_->assertCurrent();
+    return combinedSessionID_;
+  });
   return path ? std::optional<String>(path->text()) : std::nullopt;
 }
 
 void KYTReportingBackend::setCombinedSessionIDString(std::optional<String> value) {
   std::optional<SessionIDPath> path;
   if (value) path = SessionIDPath(std::move(*value));
-  stateQueue_->sync([&] { combinedSessionID_ = std::move(path); });
+  stateQueue_->sync([&] {
+    stateQueue_->assertCurrent();
+    combinedSessionID_ = std::move(path);
+  });
 }
 
 Value KYTReportingBackend::samplingThreshold() const {
-  return stateQueue_->sync([this] { return samplingThreshold_; });
+  return stateQueue_->sync([this] {
+    stateQueue_->assertCurrent();
+    return samplingThreshold_;
+  });
 }
 
 void KYTReportingBackend::setSamplingThreshold(Value value) {
-  stateQueue_->sync([&] { samplingThreshold_ = std::move(value); });
+  stateQueue_->sync([&] {
+    stateQueue_->assertCurrent();
+    samplingThreshold_ = std::move(value);
+  });
 }
 
 String KYTReportingBackend::getPersistentIdentifierForDNU(bool respectDnu) {

@@ -26,11 +26,12 @@
 #include "platform/base/Clock.h"
 #include "platform/base/Error.h"
 #include "platform/base/Function.h"
+#include "platform/base/Mutex.h"
 #include "platform/objects/Value.h"
+#include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 
-class SerialQueue;
 class UserAccount;
 struct Platform;
 
@@ -146,12 +147,14 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] uint16_t eventNumber() const { return eventID_; }
   void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }
   void setEventBlacklist(std::optional<Array> list) { eventBlacklist_ = std::move(list); }
-  [[nodiscard]] SerialQueue& stateQueue() const { return *stateQueue_; }
-  [[nodiscard]] int32_t stateOnQueue() const { return state_; }
-  [[nodiscard]] const std::optional<SessionIDPath>& combinedSessionIDOnQueue() const {
+  [[nodiscard]] SerialQueue& stateQueue() const RETURN_CAPABILITY(*stateQueue_) { return *stateQueue_; }
+  [[nodiscard]] int32_t stateOnQueue() const REQUIRES(stateQueue()) { return state_; }
+  [[nodiscard]] const std::optional<SessionIDPath>& combinedSessionIDOnQueue() const REQUIRES(stateQueue()) {
     return combinedSessionID_;
   }
-  void setCombinedSessionIDOnQueue(const SessionIDPath& sessionID) { combinedSessionID_ = sessionID; }
+  void setCombinedSessionIDOnQueue(const SessionIDPath& sessionID) REQUIRES(stateQueue()) {
+    combinedSessionID_ = sessionID;
+  }
   // Runs what was handed to the state queue and has not begun.
   void drainStateQueue();
   // A random identifier that stays the same on this device, created on first use: one for reports that
@@ -177,10 +180,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::shared_ptr<UserAccount> userAccount_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
-  // The state queue.
-  int32_t state_ = kBackendStateUndecided;
-  std::optional<SessionIDPath> combinedSessionID_;
-  Value samplingThreshold_;
+  int32_t state_ GUARDED_BY(*stateQueue_) = kBackendStateUndecided;
+  std::optional<SessionIDPath> combinedSessionID_ GUARDED_BY(*stateQueue_);
+  Value samplingThreshold_ GUARDED_BY(*stateQueue_);
 };
 
 }  // namespace kyt

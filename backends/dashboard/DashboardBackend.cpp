@@ -90,8 +90,10 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
   auto backend = std::make_shared<DashboardBackend>(Making(), platform, name, profile, facts,
                                                     std::get<std::unique_ptr<UDPSocket>>(std::move(opened)));
   // On the network queue: a datagram that comes from anywhere before all is in place waits there until it is.
-  const bool started =
-      backend->networkProcQueue_->sync([&] { return backend->start(profile, serverIP, serverPort); });
+  const bool started = backend->networkProcQueue_->sync([&] {
+    backend->networkProcQueue_->assertCurrent();
+    return backend->start(profile, serverIP, serverPort);
+  });
   // What was made so far ends with the object: the sources, the queue, the socket.
   if (!started) return nullptr;
   return backend;
@@ -160,7 +162,10 @@ bool DashboardBackend::startTimer() {
   // More leeway than half a short period would lose ticks.
   timer_ = platform().timers.every(
       period_, std::min(kLeeway, period_ / 2), networkProcQueue_, [weak = std::move(weak)] {
-        if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->myPeriodicTask();
+        const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock());
+        if (self == nullptr) return;
+        self->networkProcQueue_->assertCurrent();
+        self->myPeriodicTask();
       });
   return static_cast<bool>(timer_);
 }
@@ -231,8 +236,10 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
 
   Value line = writeLocalLog(datagram->bytes());
   networkProcQueue_->async([self = std::static_pointer_cast<DashboardBackend>(shared_from_this()),
-                            datagram = std::move(datagram),
-                            eventID] { self->tryToSendMsg(*datagram, eventID); });
+                            datagram = std::move(datagram), eventID] {
+    self->networkProcQueue_->assertCurrent();
+    self->tryToSendMsg(*datagram, eventID);
+  });
   return line;
 }
 

@@ -67,19 +67,23 @@ class DashboardBackend : public KYTReportingBackend {
   // `datagram` is a whole one, its text terminated.
   [[nodiscard]] static String writeLocalLog(const std::byte* datagram);
 
-  // On the network queue alone.
-  void tryToSendMsg(const DashboardDatagram& datagram, EventID eventNumber);
-  void processSocketRead();
-  void myPeriodicTask();
-  void cleanupSources();
+  [[nodiscard]] SerialQueue& networkProcQueue() const RETURN_CAPABILITY(*networkProcQueue_) {
+    return *networkProcQueue_;
+  }
+  void tryToSendMsg(const DashboardDatagram& datagram, EventID eventNumber) REQUIRES(networkProcQueue());
+  void processSocketRead() REQUIRES(networkProcQueue());
+  void myPeriodicTask() REQUIRES(networkProcQueue());
+  void cleanupSources() REQUIRES(networkProcQueue());
 
-  // On the network queue alone, for tests: -1 once closed.
-  [[nodiscard]] int32_t socketDescriptor() const { return socket_ ? socket_->descriptor() : -1; }
-  [[nodiscard]] const std::deque<std::unique_ptr<UDPPacketToSend>>& messageQueue() const {
+  // For tests, while nothing runs on the network queue; so they are not analysed. -1 once closed.
+  [[nodiscard]] int32_t socketDescriptor() const NO_THREAD_SAFETY_ANALYSIS {
+    return socket_ ? socket_->descriptor() : -1;
+  }
+  [[nodiscard]] const std::deque<std::unique_ptr<UDPPacketToSend>>& messageQueue() const
+      NO_THREAD_SAFETY_ANALYSIS {
     return messageQueue_;
   }
-  [[nodiscard]] int32_t cleanupState() const { return cleanupState_; }
-  [[nodiscard]] SerialQueue& networkProcQueue() const { return *networkProcQueue_; }
+  [[nodiscard]] int32_t cleanupState() const NO_THREAD_SAFETY_ANALYSIS { return cleanupState_; }
 
   [[nodiscard]] bool reliableUDP() const { return reliableUDP_; }
   [[nodiscard]] bool usingProfile() const { return usingProfile_; }
@@ -88,20 +92,20 @@ class DashboardBackend : public KYTReportingBackend {
  private:
   // The making after the socket is open, on the network queue; false after a failure, which is logged.
   [[nodiscard]] bool start(const std::optional<Dictionary>& profile, const std::optional<String>& serverIP,
-                           uint16_t serverPort);
-  void forgetWhatCameEarlier();
-  void readProfile(const Dictionary& profile);
-  void useReliableUDP();
+                           uint16_t serverPort) REQUIRES(networkProcQueue());
+  void forgetWhatCameEarlier() REQUIRES(networkProcQueue());
+  void readProfile(const Dictionary& profile) REQUIRES(networkProcQueue());
+  void useReliableUDP() REQUIRES(networkProcQueue());
   [[nodiscard]] DashboardDatagram::Header headerFor(const TimeValue& timestamp, uint16_t method,
                                                     uint16_t respCode, EventID eventID) const;
   static void appendPairs(const Dictionary& message, DashboardDatagram& datagram);
-  [[nodiscard]] bool startTimer();
+  [[nodiscard]] bool startTimer() REQUIRES(networkProcQueue());
   // A datagram went out in full.
-  [[nodiscard]] bool send(std::span<const std::byte> datagram);
-  // Each answers whether the record is done with.
-  [[nodiscard]] bool checkWaiting(UDPPacketToSend& packet);
-  [[nodiscard]] bool checkUnsent(UDPPacketToSend& packet);
-  void scheduleLastResort();
+  [[nodiscard]] bool send(std::span<const std::byte> datagram) REQUIRES(networkProcQueue());
+  // Each returns whether the record is done with.
+  [[nodiscard]] bool checkWaiting(UDPPacketToSend& packet) REQUIRES(networkProcQueue());
+  [[nodiscard]] bool checkUnsent(UDPPacketToSend& packet) REQUIRES(networkProcQueue());
+  void scheduleLastResort() REQUIRES(networkProcQueue());
   [[nodiscard]] bool finishUpload(const std::optional<Data>& reply, const std::optional<Error>& error);
 
   // Constant after the making.
@@ -110,13 +114,14 @@ class DashboardBackend : public KYTReportingBackend {
   bool reliableUDP_ = false;
   bool usingProfile_ = false;
   Duration period_;
-  // The network queue's. The sources end before the socket.
-  std::unique_ptr<UDPSocket> socket_;
-  std::deque<std::unique_ptr<UDPPacketToSend>> messageQueue_;
-  int32_t cleanupState_ = 0;
-  Watch readSource_;
-  TimerHandle timer_, lastResort_;
-  std::shared_ptr<DashboardBackend> keptAlive_;  // from a clean-up with packets to its end
+  // The sources end before the socket.
+  std::unique_ptr<UDPSocket> socket_ GUARDED_BY(*networkProcQueue_);
+  std::deque<std::unique_ptr<UDPPacketToSend>> messageQueue_ GUARDED_BY(*networkProcQueue_);
+  int32_t cleanupState_ GUARDED_BY(*networkProcQueue_) = 0;
+  Watch readSource_ GUARDED_BY(*networkProcQueue_);
+  TimerHandle timer_ GUARDED_BY(*networkProcQueue_), lastResort_ GUARDED_BY(*networkProcQueue_);
+  // From a clean-up with packets to its end.
+  std::shared_ptr<DashboardBackend> keptAlive_ GUARDED_BY(*networkProcQueue_);
 };
 
 }  // namespace kyt

@@ -26,14 +26,16 @@ void DashboardBackend::useReliableUDP() {
   }
   reliableUDP_ = true;
   // Reported once for each time that it is armed, so that the reactor does not spin while the queue waits.
-  readSource_ = platform().reactor.watch(
-      socket_->descriptor(), ready::readable | ready::oneShot,
-      [weak = weak_from_this(), queue = networkProcQueue_](unsigned) {
-        queue->async([weak] {
-          if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock()))
-            self->processSocketRead();
-        });
-      });
+  readSource_ = platform().reactor.watch(socket_->descriptor(), ready::readable | ready::oneShot,
+                                         [weak = weak_from_this(), queue = networkProcQueue_](unsigned) {
+                                           queue->async([weak] {
+                                             const auto self =
+                                                 std::static_pointer_cast<DashboardBackend>(weak.lock());
+                                             if (self == nullptr) return;
+                                             self->networkProcQueue_->assertCurrent();
+                                             self->processSocketRead();
+                                           });
+                                         });
   if (!readSource_) platform().log.error("DashboardBackend(useReliableUDP): can't create read source");
 }
 
@@ -42,7 +44,6 @@ bool DashboardBackend::send(std::span<const std::byte> datagram) {
 }
 
 void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID eventNumber) {
-  networkProcQueue_->assertCurrent();
   const bool sent = send({datagram.bytes(), datagram.length()});
   if (sent && !reliableUDP_) return;
   // Where the user's memory is used up, older ones of this back end give way; without any this one is not kept.
@@ -63,7 +64,6 @@ void DashboardBackend::tryToSendMsg(const DashboardDatagram& datagram, EventID e
 }
 
 void DashboardBackend::processSocketRead() {
-  networkProcQueue_->assertCurrent();
   if (socket_ == nullptr) return;
   std::array<std::byte, DashboardDatagram::kSize> buffer{};
   const int64_t received = socket_->receive(buffer);
@@ -104,7 +104,6 @@ bool DashboardBackend::checkUnsent(UDPPacketToSend& packet) {
 }
 
 void DashboardBackend::myPeriodicTask() {
-  networkProcQueue_->assertCurrent();
   for (size_t i = 0; i < messageQueue_.size();) {
     UDPPacketToSend& packet = *messageQueue_[i];
     bool done = false;
@@ -133,12 +132,16 @@ void DashboardBackend::scheduleLastResort() {
   if (lastResort_) return;  // a second clean-up does not put off the end that the first one set
   lastResort_ = platform().timers.after(
       std::chrono::milliseconds(kLastResortMilliseconds), networkProcQueue_, [weak = weak_from_this()] {
-        if (const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock())) self->cleanupSources();
+        const auto self = std::static_pointer_cast<DashboardBackend>(weak.lock());
+        if (self == nullptr) return;
+        self->networkProcQueue_->assertCurrent();
+        self->cleanupSources();
       });
 }
 
 void DashboardBackend::cleanup() {
   networkProcQueue_->async([self = std::static_pointer_cast<DashboardBackend>(shared_from_this())] {
+    self->networkProcQueue_->assertCurrent();
     if (self->messageQueue_.empty()) {
       self->cleanupSources();
       return;
@@ -149,7 +152,6 @@ void DashboardBackend::cleanup() {
 }
 
 void DashboardBackend::cleanupSources() {
-  networkProcQueue_->assertCurrent();
   const auto kept = std::move(keptAlive_);  // whoever called holds the object until it has returned
   lastResort_.cancel();
   timer_.cancel();

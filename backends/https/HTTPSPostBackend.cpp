@@ -158,7 +158,10 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
     int32_t state;
     std::optional<SessionIDPath> sessionID;
   };
-  const Shared now = stateQueue().sync([this] { return Shared{stateOnQueue(), combinedSessionIDOnQueue()}; });
+  const Shared now = stateQueue().sync([this] {
+    stateQueue().assertCurrent();
+    return Shared{stateOnQueue(), combinedSessionIDOnQueue()};
+  });
   const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
     platform().counters.add(Reason::eventDroppedByState);
@@ -190,8 +193,10 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
 Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                                        MessageFlag flag) {
   Value flushed;
-  if (state == kBackendStateEnabled && isRealtime(flag) &&
-      stateQueue().sync([this] { return batch_.exists(); })) {
+  if (state == kBackendStateEnabled && isRealtime(flag) && stateQueue().sync([this] {
+        stateQueue().assertCurrent();
+        return batch_.exists();
+      })) {
     platform().log.debug(
         "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here to keep events in order.");
     flushed = flushMessagesWithCompletion(nullptr);

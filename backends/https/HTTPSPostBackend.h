@@ -114,7 +114,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void giveBackToUser(uint64_t bytes) const;
   void countDroppedByLimit() const;
   void countDroppedByUser() const;
-  [[nodiscard]] BatchTaking takeBatchOnQueue(EventBatch::Taken& batch);
+  [[nodiscard]] BatchTaking takeBatchOnQueue(EventBatch::Taken& batch) REQUIRES(stateQueue());
   void tellDiscarded(size_t events, const char* why) const;
   [[nodiscard]] bool admits(const Dictionary& record) const;
   [[nodiscard]] Array recordsToPost(EventBatch::Taken batch) const;
@@ -131,8 +131,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   bool immutable_ = false;   // once set, the state is no longer decided anew
   size_t jsonSizeHint_ = 0;  // size of the last message
 
-  // The state queue.
-  EventBatch batch_;
+  EventBatch batch_ GUARDED_BY(stateQueue());
 };
 
 }  // namespace kyt

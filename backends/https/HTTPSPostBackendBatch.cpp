@@ -36,6 +36,7 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
   const int32_t method = methodOf(record);
   uint64_t batched = 0;
   int32_t count = stateQueue().sync([&] {
+    stateQueue().assertCurrent();
     batch_.begin();
     batched = batch_.bytes();
     return batch_.count(method);
@@ -47,15 +48,22 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
         method);
     flushed = flushMessagesWithCompletion(nullptr);
     count = 0;
-    batched = stateQueue().sync([this] { return batch_.bytes(); });  // a flush may have kept the batch
+    batched = stateQueue().sync([this] {
+      stateQueue().assertCurrent();
+      return batch_.bytes();  // a flush may have kept the batch
+    });
   }
   const uint64_t bytes = roughSize(record);
   if (!hasRoomFor(batched, bytes)) {
     // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
-    stateQueue().async([this] { batch_.endIfEmpty(); });
+    stateQueue().async([this] {
+      stateQueue().assertCurrent();
+      batch_.endIfEmpty();
+    });
     return flushed;
   }
   stateQueue().async([this, record = std::move(record), method, count, bytes]() mutable {
+    stateQueue().assertCurrent();
     batch_.append(std::move(record), method, count + 1, bytes, combinedSessionIDOnQueue());
   });
   return flushed;
@@ -109,7 +117,11 @@ void HTTPSPostBackend::tellDiscarded(size_t events, const char* why) const {
 
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
   EventBatch::Taken batch;
-  switch (stateQueue().sync([&] { return takeBatchOnQueue(batch); })) {
+  const BatchTaking taking = stateQueue().sync([&] {
+    stateQueue().assertCurrent();
+    return takeBatchOnQueue(batch);
+  });
+  switch (taking) {
     case BatchTaking::discarded:
       giveBackToUser(batch.bytes);
       platform().counters.add(Reason::batchDiscarded, batch.records.size());
@@ -196,14 +208,17 @@ Array HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const {
 
 void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {
   stateQueue().sync([&] {
+    stateQueue().assertCurrent();
     setCombinedSessionIDOnQueue(sessionID);
     batch_.sessionIDChanged();
   });
 }
 
 uint64_t HTTPSPostBackend::batchedEventsSize() {
-  return stateQueue().sync(
-      [this] { return batch_.sizeEstimate(combinedSessionIDOnQueue(), platform().memory); });
+  return stateQueue().sync([this] {
+    stateQueue().assertCurrent();
+    return batch_.sizeEstimate(combinedSessionIDOnQueue(), platform().memory);
+  });
 }
 
 }  // namespace kyt

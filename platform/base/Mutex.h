@@ -1,4 +1,5 @@
-// The locks of this project, annotated so that clang's thread-safety analysis can check every guarded field.
+// The locks of this project, annotated so that clang's thread-safety analysis can check every guarded field. Serial queues
+// (platform/queues/SerialQueue.h) are annotated with the same macros.
 //
 // `Mutex` is for the few private, short critical sections. `Monitor` is the recursive lock tied to an object (the
 // agent's lock): who holds it may call operations that take it again. Both may be used from any thread; neither

@@ -18,10 +18,11 @@ DBusConnection::DBusConnection(std::shared_ptr<ServerContext> context, std::uniq
       number_(number),
       user_(peer.uid),
       process_(peer.pid),
+      descriptor_(stream->descriptor()),
       account_(std::move(account)),
       queue_(SerialQueue::create("kyt.connection", context_->services.executor, uint64_t{peer.uid} + 1)),
-      stream_(std::move(stream)),
       peer_(std::make_unique<PeerCredentials>(std::move(peer))),
+      stream_(std::move(stream)),
       keptCharge_(account_, Share::bytes),
       descriptorsCharge_(account_, Share::descriptors) {}
 
@@ -29,9 +30,13 @@ DBusConnection::~DBusConnection() = default;
 
 void DBusConnection::offer(Listener& listener, ListenerDelegate& delegate) {
   const std::shared_ptr<ConnectionOutput::Observer> observer(shared_from_this(), this);
-  output_ = std::make_shared<ConnectionOutput>(*stream_, observer, context_->services.limits.maxQueuedBytes,
-                                               account_);
+  queue_->sync([&] {
+    queue_->assertCurrent();
+    output_ = std::make_shared<ConnectionOutput>(*stream_, observer, context_->services.limits.maxQueuedBytes,
+                                                 account_);
+  });
   queue_->async([self = shared_from_this(), &listener, &delegate] {
+    self->queue_->assertCurrent();
     if (self->ended_ || self->closed()) return;
     const bool accepted = delegate.listenerShouldAcceptNewConnection(listener, self);
     self->peer_.reset();
@@ -57,21 +62,33 @@ void DBusConnection::start() {
       std::chrono::duration_cast<Duration>(std::chrono::duration<double>(Limits::handshakeSeconds));
   handshakeTimer_ = context_->services.timers.after(patience, queue_, [weak = weak_from_this()] {
     const auto self = weak.lock();
-    if (!self || !self->handshake_ || self->ended_) return;
-    const ClientScope scope(self->user_);
-    self->breakOff(Reason::handshakeTimedOut, "the handshake took too long");
-    self->end(true, false);
+    if (self == nullptr) return;
+    self->queue_->assertCurrent();
+    self->handshakeTookTooLong();
   });
   armRead();
 }
 
+void DBusConnection::handshakeTookTooLong() {
+  if (!handshake_ || ended_) return;
+  const ClientScope scope(user_);
+  breakOff(Reason::handshakeTimedOut, "the handshake took too long");
+  end(true, false);
+}
+
 Value DBusConnection::entitlementValue(std::string_view key) {
+  queue_->assertCurrent();
   Value value = peer_ ? context_->services.entitlements.valueFor(*peer_, key) : Value();
   refused_ = !value.boolValue();
   return value;
 }
 
 std::string DBusConnection::description() const {
+  queue_->assertCurrent();
+  return descriptionOnQueue();
+}
+
+std::string DBusConnection::descriptionOnQueue() const {
   char text[96];
   std::snprintf(text, sizeof text, "%llu of process %d, user %u", static_cast<unsigned long long>(number_),
                 process_, user_);
@@ -85,12 +102,28 @@ std::string DBusConnection::description() const {
 }
 
 void DBusConnection::setExportedObject(std::shared_ptr<ClientSessionInterface> object) {
+  queue_->assertCurrent();
   exportedObject_ = std::move(object);
+}
+
+void DBusConnection::setInterruptionHandler(Task handler) {
+  queue_->assertCurrent();
+  interruptionHandler_ = std::move(handler);
+}
+
+void DBusConnection::setInvalidationHandler(Task handler) {
+  queue_->assertCurrent();
+  invalidationHandler_ = std::move(handler);
+}
+
+void DBusConnection::resume() {
+  queue_->assertCurrent();
+  resumed_ = true;
 }
 
 void DBusConnection::invalidate() {
   hurried_ = true;
-  if (!invalidating_.exchange(true)) queue_->async([self = shared_from_this()] { self->end(false, false); });
+  if (!invalidating_.exchange(true)) endLater(false);
   scheduleTurn();  // closes a connection that has ended and only waits to be written
 }
 
@@ -115,11 +148,19 @@ void DBusConnection::abandon() {
 // Reports the one problem that ends the connection.
 DBusConnection::Step DBusConnection::breakOff(Reason reason, const char* problem) {
   context_->services.counters.add(reason);
-  context_->services.log.normal("DBusConnection(end): connection %s: %s", description().c_str(), problem);
+  context_->services.log.normal("DBusConnection(end): connection %s: %s", descriptionOnQueue().c_str(),
+                                problem);
   return Step::broken;
 }
 
-// The end. Runs on the queue; the second call does nothing.
+void DBusConnection::endLater(bool broken) {
+  queue_->async([self = shared_from_this(), broken] {
+    self->queue_->assertCurrent();
+    self->end(broken, false);
+  });
+}
+
+// The second call does nothing.
 void DBusConnection::end(bool broken, bool waitForOutput) {
   if (closed() || std::exchange(ended_, true)) return;
   const ClientScope scope(user_);
@@ -160,7 +201,10 @@ void DBusConnection::closeStream() {
 
 void DBusConnection::scheduleTurn() {
   if (turnScheduled_.exchange(true)) return;
-  queue_->async([self = shared_from_this()] { self->turn(); });
+  queue_->async([self = shared_from_this()] {
+    self->queue_->assertCurrent();
+    self->turn();
+  });
 }
 
 void DBusConnection::armRead() {
@@ -177,17 +221,16 @@ void DBusConnection::armWatch(unsigned events) {
   if (watch_) {
     if (watch_.modify(wanted)) return;
   } else {
-    watch_ = context_->services.reactor.watch(stream_->descriptor(), wanted,
-                                              [weak = weak_from_this()](unsigned happened) {
-                                                if (const auto self = weak.lock())
-                                                  self->handleReady(happened);
-                                              });
+    watch_ =
+        context_->services.reactor.watch(descriptor_, wanted, [weak = weak_from_this()](unsigned happened) {
+          if (const auto self = weak.lock()) self->handleReady(happened);
+        });
     if (watch_) return;
   }
   context_->services.log.error("DBusConnection(armWatch): the system refuses to watch connection %llu",
                                static_cast<unsigned long long>(number_));
   invalidating_ = true;
-  queue_->async([self = shared_from_this()] { self->end(true, false); });
+  endLater(true);
 }
 
 // On the reactor's thread.
@@ -236,7 +279,7 @@ void DBusConnection::outputBroken() {
     scheduleTurn();  // a connection that waits to be written ends now
     return;
   }
-  queue_->async([self = shared_from_this()] { self->end(true, false); });
+  endLater(true);
 }
 
 std::optional<Error> DBusConnection::sendMessageToClient(std::optional<Dictionary> sessionInfo,

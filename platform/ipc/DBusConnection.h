@@ -51,9 +51,9 @@ class DBusConnection final : public Connection,
   [[nodiscard]] uint32_t peerUser() const override { return user_; }
   [[nodiscard]] std::shared_ptr<UserAccount> userAccount() const override { return account_; }
   void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
-  void setInterruptionHandler(Task handler) override { interruptionHandler_ = std::move(handler); }
-  void setInvalidationHandler(Task handler) override { invalidationHandler_ = std::move(handler); }
-  void resume() override { resumed_ = true; }
+  void setInterruptionHandler(Task handler) override;
+  void setInvalidationHandler(Task handler) override;
+  void resume() override;
   void invalidate() override;
   void finish() override;
   [[nodiscard]] ClientSessionReplyInterface& remoteObjectProxy() override { return *this; }
@@ -77,26 +77,31 @@ class DBusConnection final : public Connection,
     HeaderMemory header;
   };
 
-  void turn();
+  // Those that require the queue are its work, or steps of it.
+  void turn() REQUIRES(*queue_);
   void countCall(Progress& progress) const;
-  Step runSteps(Progress& progress);
-  Step step(std::span<std::byte> buffer, Progress& progress);
-  Step readMore(std::span<std::byte> buffer, size_t& bytes);
-  Step handleBytes(std::span<const std::byte> bytes, size_t& consumed, Progress& progress);
-  Step handleHandshake(std::span<const std::byte> bytes, size_t& consumed);
-  Step handleMessage(std::span<const std::byte> bytes, size_t& consumed, HeaderMemory& header);
-  Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken);
+  Step runSteps(Progress& progress) REQUIRES(*queue_);
+  Step step(std::span<std::byte> buffer, Progress& progress) REQUIRES(*queue_);
+  Step readMore(std::span<std::byte> buffer, size_t& bytes) REQUIRES(*queue_);
+  Step handleBytes(std::span<const std::byte> bytes, size_t& consumed, Progress& progress) REQUIRES(*queue_);
+  Step handleHandshake(std::span<const std::byte> bytes, size_t& consumed) REQUIRES(*queue_);
+  Step handleMessage(std::span<const std::byte> bytes, size_t& consumed, HeaderMemory& header)
+      REQUIRES(*queue_);
+  Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken) REQUIRES(*queue_);
   [[nodiscard]] bool mustPause() const;
-  Step keepRest(std::span<const std::byte> rest);
-  Step tooManyBytes();
-  void watchBegunMessage();
-  void messageTookTooLong();
-  Step breakOff(Reason reason, const char* problem);
+  Step keepRest(std::span<const std::byte> rest) REQUIRES(*queue_);
+  Step tooManyBytes() REQUIRES(*queue_);
+  void watchBegunMessage() REQUIRES(*queue_);
+  void messageTookTooLong() REQUIRES(*queue_);
+  Step breakOff(Reason reason, const char* problem) REQUIRES(*queue_);
+  [[nodiscard]] std::string descriptionOnQueue() const REQUIRES(*queue_);
 
-  void countRefusal();
-  void start();
-  void end(bool broken, bool waitForOutput);
-  void closeStream();
+  void countRefusal() REQUIRES(*queue_);
+  void start() REQUIRES(*queue_);
+  void handshakeTookTooLong() REQUIRES(*queue_);
+  void end(bool broken, bool waitForOutput) REQUIRES(*queue_);
+  void endLater(bool broken);
+  void closeStream() REQUIRES(*queue_);
   [[nodiscard]] bool closed() const { return closed_; }
   void scheduleTurn();
   void armRead();
@@ -118,6 +123,7 @@ class DBusConnection final : public Connection,
   const uint64_t number_;
   const uint32_t user_;
   const int32_t process_;
+  const int descriptor_;  // the stream's
   const std::shared_ptr<UserAccount> account_;
   const std::shared_ptr<SerialQueue> queue_;
 
@@ -129,23 +135,28 @@ class DBusConnection final : public Connection,
   std::atomic<bool> peerGone_{false};      // the reactor saw the end of the client's side
   std::atomic<bool> turnScheduled_{false};
 
-  // Of the queue.
-  std::unique_ptr<Stream> stream_;
-  std::unique_ptr<PeerCredentials> peer_;  // until resumed
-  std::unique_ptr<ServerHandshake> handshake_;
-  TimerHandle handshakeTimer_;
-  std::shared_ptr<ClientSessionInterface> exportedObject_;
-  Task interruptionHandler_, invalidationHandler_;
-  std::string kept_;   // the beginning of a message, or messages that the last turn left
-  size_t needed_ = 0;  // how much kept_ must hold before it is worth looking at
-  std::vector<Descriptor> descriptors_;
-  Charge keptCharge_, descriptorsCharge_;  // for these
-  TimerHandle messageTimer_;               // while a message is unfinished, and a little longer
-  bool messageTimed_ = false;
-  uint64_t messages_ = 0, timedMessages_ = 0;  // handled by now, and when the timer was set
-  bool descriptorsAgreed_ = false;
-  bool refused_ = false;  // what was asked for was not granted
-  bool resumed_ = false, started_ = false, ended_ = false;
+  // Until it is resumed, who the client is.
+  std::unique_ptr<PeerCredentials> peer_ GUARDED_BY(*queue_);
+  std::unique_ptr<Stream> stream_ GUARDED_BY(*queue_);
+  std::unique_ptr<ServerHandshake> handshake_ GUARDED_BY(*queue_);
+  TimerHandle handshakeTimer_ GUARDED_BY(*queue_);
+  std::shared_ptr<ClientSessionInterface> exportedObject_ GUARDED_BY(*queue_);
+  Task interruptionHandler_ GUARDED_BY(*queue_), invalidationHandler_ GUARDED_BY(*queue_);
+  // The beginning of a message, or messages that the last turn left; and how much it must hold before it is worth
+  // looking at.
+  std::string kept_ GUARDED_BY(*queue_);
+  size_t needed_ GUARDED_BY(*queue_) = 0;
+  std::vector<Descriptor> descriptors_ GUARDED_BY(*queue_);
+  Charge keptCharge_ GUARDED_BY(*queue_), descriptorsCharge_ GUARDED_BY(*queue_);  // for these
+  // While a message is unfinished, and a little longer.
+  TimerHandle messageTimer_ GUARDED_BY(*queue_);
+  bool messageTimed_ GUARDED_BY(*queue_) = false;
+  // Handled by now, and when the timer was set.
+  uint64_t messages_ GUARDED_BY(*queue_) = 0, timedMessages_ GUARDED_BY(*queue_) = 0;
+  bool descriptorsAgreed_ GUARDED_BY(*queue_) = false;
+  bool refused_ GUARDED_BY(*queue_) = false;  // what was asked for was not granted
+  bool resumed_ GUARDED_BY(*queue_) = false, started_ GUARDED_BY(*queue_) = false;
+  bool ended_ GUARDED_BY(*queue_) = false;
 
   // The queue, the reactor's thread and writers arm the watch. The mutex is held over the system call; the handler does
   // without it, since what was armed may be ready at once.

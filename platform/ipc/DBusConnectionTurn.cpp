@@ -71,7 +71,10 @@ void DBusConnection::watchBegunMessage() {
   const auto patience =
       std::chrono::duration_cast<Duration>(std::chrono::duration<double>(Limits::messageSeconds));
   messageTimer_ = context_->services.timers.after(patience, queue_, [weak = weak_from_this()] {
-    if (const auto self = weak.lock()) self->messageTookTooLong();
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    self->queue_->assertCurrent();
+    self->messageTookTooLong();
   });
 }
 

@@ -60,7 +60,7 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
       if (stopped_) return;
       accepting_ = true;
     }
-    queue_->async([self = shared_from_this()] { self->acceptSome(); });
+    queue_->async([self = shared_from_this()] { self->acceptWhatCame(); });
   }
 
   // The queue's work is done and none comes: what it refers to may go. Not from the queue.
@@ -74,7 +74,13 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     return accepting_;
   }
 
-  void acceptSome() {
+  // The queue's work.
+  void acceptWhatCame() {
+    queue_->assertCurrent();
+    acceptSome();
+  }
+
+  void acceptSome() REQUIRES(*queue_) {
     for (unsigned i = 0; i < kAcceptsPerTurn && accepting(); ++i) {
       std::unique_ptr<Stream> stream;
       switch (acceptor_->accept(stream)) {
@@ -98,7 +104,8 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     watch_ = context_->services.reactor.watch(acceptor_->descriptor(), ready::readable | ready::oneShot,
                                               [weak = weak_from_this()](unsigned) {
                                                 const auto self = weak.lock();
-                                                if (self) self->queue_->async([self] { self->acceptSome(); });
+                                                if (self)
+                                                  self->queue_->async([self] { self->acceptWhatCame(); });
                                               });
   }
 
@@ -135,11 +142,11 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
   }
   void pauseLocked(Duration time) REQUIRES(mutex_) {
     pause_ = context_->services.timers.after(time, queue_, [weak = weak_from_this()] {
-      if (const auto self = weak.lock()) self->acceptSome();
+      if (const auto self = weak.lock()) self->acceptWhatCame();
     });
   }
 
-  void take(std::unique_ptr<Stream> stream) {
+  void take(std::unique_ptr<Stream> stream) REQUIRES(*queue_) {
     PeerCredentials peer = stream->peer();
     const uint32_t user = peer.uid;
     std::shared_ptr<UserAccount> account = context_->services.budget.account(user);
@@ -167,7 +174,7 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
   Listener& listener_;
   const std::shared_ptr<SerialQueue> queue_;
   ListenerDelegate* delegate_ = nullptr;
-  uint64_t lastNumber_ = 0;  // of the queue
+  uint64_t lastNumber_ GUARDED_BY(*queue_) = 0;
   Mutex mutex_;
   Watch watch_ GUARDED_BY(mutex_);
   TimerHandle pause_ GUARDED_BY(mutex_);

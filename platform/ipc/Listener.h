@@ -19,6 +19,9 @@ class UserAccount;
 class Connection {
  public:
   virtual ~Connection() = default;
+  // entitlementValue(), description() and what is set before resume(), which it ends, are called on queue(); the rest by
+  // any thread.
+  //
   // The value that the peer holds under an entitlement key; null when it holds none. Only before resume().
   [[nodiscard]] virtual Value entitlementValue(std::string_view key) = 0;
   // One line for logs: what identifies the peer (process, user, executable) and this connection.

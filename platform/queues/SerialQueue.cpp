@@ -98,10 +98,6 @@ bool SerialQueue::isCurrent() const noexcept {
   return runner_.load(std::memory_order_relaxed) == &identity;
 }
 
-void SerialQueue::assertCurrent() const {
-  assert(isCurrent());
-}
-
 void SerialQueue::async(Task task) {
   Node* node = NodeCache::ofThread().make(std::move(task));
   std::shared_ptr<SerialQueue> self;
