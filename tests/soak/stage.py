@@ -34,6 +34,7 @@ class LogReader(threading.Thread):
         self.reads.set()
         self.last, self.reports = [], []
         self.counters, self.requests = {}, None
+        self.started = threading.Event()
         self.file = open(path, "a", errors="replace")
 
     def run(self):
@@ -42,6 +43,8 @@ class LogReader(threading.Thread):
             self.last = (self.last + [line])[-50:]
             if self.SANITIZER.search(line) or self.reports:
                 self.reports = (self.reports + [line])[:200]
+            if "main: Listener resumes" in line:
+                self.started.set()
             if "shutDown: " in line:
                 self.read_figure(line)
             if self.file.tell() < 1 << 28:
@@ -200,7 +203,8 @@ class Stage:
         self.reader.start()
         self.heard_before = self.heard()
         deadline = time.monotonic() + 60
-        while not self.takes_connections():
+        # Its socket is there before it has read what it reads at its start.
+        while not (self.reader.started.is_set() and self.takes_connections()):
             if self.daemon.poll() is not None or time.monotonic() > deadline:
                 raise Failure("the daemon does not start:\n" + "".join(self.reader.last))
             time.sleep(0.02)
