@@ -64,7 +64,10 @@ class Pacer(threading.Thread):
         base, arrived, changed, holds = self.sink.figures()["events"], -1, time.monotonic(), False
         while not self.over.wait(0.03):
             now, former = time.monotonic(), arrived
-            arrived = self.sink.figures()["events"]
+            try:
+                arrived = self.sink.figures()["events"]
+            except OSError:
+                continue  # the sink is busy
             under_way = sum(book.handed_over() for book in self.books) - (arrived - base)
             if arrived != former:
                 changed = now
