@@ -92,6 +92,7 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
       if (key != nullptr && key->string() != nullptr) {
         filter.foldedKey = foldCase(*key->string());
         filter.sizes = unfoldedSizes(*filter.foldedKey);
+        filter.ends = filter.foldedKey->empty() ? 0 : endsOf(*filter.foldedKey);
         addShapes(filter);
       }
       const Value* action = dictionary->find("action");
@@ -115,8 +116,10 @@ void EventFilters::addShapes(const Filter& filter) {
 }
 
 EventFilters::Action EventFilters::actionForKey(std::string_view key, const Numbers& numbers) const {
+  const uint32_t ends = key.empty() ? 0 : endsOf(key);
   for (const Filter& filter : filters_) {
     if (!filter.foldedKey || key.size() < filter.sizes.least || key.size() > filter.sizes.most) continue;
+    if (ends != 0 && ends != filter.ends) continue;
     if (filter.method >= 0 && filter.method != numbers.method) continue;
     if (filter.status >= 0 && filter.status != numbers.status) continue;
     if (equalsFolded(key, *filter.foldedKey)) return filter.action;

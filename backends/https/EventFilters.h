@@ -47,6 +47,7 @@ class EventFilters {
     Action action = Action::keep;
     std::optional<std::string> foldedKey;  // none: takes its place in the table and is about no key
     UnfoldedSizes sizes;                   // of the keys that fold to it
+    uint32_t ends = 0;                     // of it; keys with ASCII ends have the same
   };
   struct Numbers {
     int32_t method, status;  // of the record
