@@ -58,6 +58,7 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   }
   void updateCorrelatedSessions(ReportingdSession& session) override {
     calls.push_back("correlated " + std::to_string(session.hierarchyLevel()));
+    EXPECT_TRUE(!session.hierarchyToken() || isLocked()) << "a member without the agent's lock";
   }
   std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(ReportingdSession&) override {
     lockedCall("ancestor");
