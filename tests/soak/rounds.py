@@ -35,6 +35,7 @@ class Round:
         self.steady, self.wild, self.intruders = [], [], []
         self.problems = []
         self.moments = []  # of faults: from, to
+        self.last_arrival = (None, 0.0)  # how many had arrived then
         self.failed_calls = {}
         self.counted = 0  # events that daemons which ended in order have dropped, as they count
         self.summary = {"accepted": 0, "arrived": 0, "lost": 0, "missing": 0, "p99": 0.0, "worst": 0.0, "before": 0.0,
@@ -226,7 +227,7 @@ class Round:
             raise Failure(f"{nonce} ended with {process.returncode}: {text}") from None
         book.close()
         lost = told["lost"] + told["dropped"]
-        arrivals = self.wait_for(nonce, told["accepted"] - lost, 90 if self.kind == "load" else 10)
+        arrivals = self.wait_for(nonce, told["accepted"] - lost)
         missing, doubled, unsent = [], 0, 0
         for number in range(FIRST_NUMBER, max(len(book.entries), len(arrivals))):
             times = arrivals[number] if number < len(arrivals) else 0
@@ -279,10 +280,14 @@ class Round:
             self.problems.append(f"{nonce}: {doubled} events came twice to one back end, {unsent} were never sent")
         self.stage.server.forget([nonce])
 
-    def wait_for(self, nonce, expected, patience):
-        deadline = time.monotonic() + patience
+    def wait_for(self, nonce, expected):
+        """That program's events, once all have arrived, or for a while nobody's do any more."""
+        patience = 90 if self.kind == "load" else 20
         while True:
             arrivals = self.stage.sink.book(nonce)
-            if len(arrivals) - arrivals.count(0) >= expected or time.monotonic() > deadline:
+            events, now = self.stage.sink.figures()["events"], time.monotonic()
+            if events != self.last_arrival[0]:
+                self.last_arrival = (events, now)
+            if len(arrivals) - arrivals.count(0) >= expected or now > self.last_arrival[1] + patience:
                 return arrivals
             time.sleep(0.1)
