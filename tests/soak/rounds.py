@@ -13,10 +13,10 @@ from intruder import become_another, intrude
 from stage import Failure
 
 STEADY, WILD, INTRUDERS = 3, 4, 3
-# An event may be lost with the moment that a fault takes. Before the moment: what its session has batched, and no session
-# of a steady program is older, not on a machine that has much else to do either. After it: a session that came meanwhile
-# goes on without what was refused to it.
-SECONDS_BEFORE, SECONDS_AFTER = 10, 5
+# An event may be lost with the moment that a fault takes. Before the moment: what its session has batched, or is on its
+# way; sessions live for some times their mean at most. After it: a session that came meanwhile goes on without what was
+# refused to it.
+SECONDS_BEFORE, SESSIONS_BEFORE, SECONDS_AFTER = 3, 3, 5
 # Counters of events that were taken and will not arrive.
 DROPS = ("not-configured", "no-storebag", "no-back-ends", "category-or-type-missing", "event-filtered",
          "not-for-this-back-end", "batch-full", "user-batches-full", "event-dropped-by-state", "batch-discarded",
@@ -246,19 +246,20 @@ class Round:
         faulty = doubled or unsent or "no answer" in told["problems"]
         if self.kind == "load":
             faulty = faulty or missing or lost or told["reconnected"] or told["problems"]
-        elsewhere = sum(1 for when in missing if not self.is_of_a_fault(when))
+        before = SECONDS_BEFORE + SESSIONS_BEFORE * self.seconds / told["sessions"]
+        elsewhere = sum(1 for when in missing if not self.is_of_a_fault(when, before))
         if faulty or elsewhere:
             self.problems.append(f"{nonce}: of {told['accepted']} events {len(missing)} are missing, {elsewhere} of them "
                                  f"not of a fault's moment, {doubled} doubled, {unsent} never sent; {told}")
 
-    def is_of_a_fault(self, when):
+    def is_of_a_fault(self, when, before):
         """Whether an event of that time may be lost; notes how far from the nearest fault's moment it is."""
         nearest = min(((begin - when, when - end) for begin, end in self.moments), key=max, default=None)
         if nearest is None:
             return False
         self.summary["before"] = max(self.summary["before"], nearest[0])
         self.summary["after"] = max(self.summary["after"], nearest[1])
-        return nearest[0] <= SECONDS_BEFORE and nearest[1] <= SECONDS_AFTER
+        return nearest[0] <= before and nearest[1] <= SECONDS_AFTER
 
     def compare_counters(self):
         """What the daemons took and did not deliver, they have counted: all but those that were killed."""
