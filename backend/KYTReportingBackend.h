@@ -65,7 +65,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   };
 
  public:
-  // A back end that does nothing, as the base alone is one.
+  // The base alone: a back end that does nothing.
   static std::shared_ptr<KYTReportingBackend> initWithName(Platform& platform, String name,
                                                            Dictionary profile, SharedSessionFacts facts);
   // Draws the sampling factor (one of 0.00, 0.01, … 1.00, equally likely).
@@ -157,8 +157,8 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   }
   // Runs what was handed to the state queue and has not begun.
   void drainStateQueue();
-  // A random identifier that stays the same on this device, created on first use: one for reports that
-  // respect the user's consent, one for those that override it.
+  // A random identifier that stays the same on this device, created on first use. Reports that respect the user's consent
+  // have one, reports that override it another.
   [[nodiscard]] String getPersistentIdentifierForDNU(bool respectDnu);
 
  private:

@@ -24,8 +24,8 @@ Loop* Loop::current() {
   std::call_once(forkHandlersInstalled, installForkHandlers);
   Loop* loop = currentLoop.load();
   if (loop != nullptr) return loop;
-  auto* made =
-      new Loop;  // never destroyed: the thread and forked children may need it until the process ends
+  // Never destroyed: the thread and forked children may need it until the process ends.
+  auto* made = new Loop;
   if (currentLoop.compare_exchange_strong(loop, made)) return made;
   delete made;
   return loop;

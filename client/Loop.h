@@ -28,7 +28,7 @@ class Loop {
   // Wakes it whatever it does: a session was closed.
   void wake() { wakeUp_.wake(); }
   [[nodiscard]] bool isCurrentThread() const;
-  // Of the moment: whether the thread waits until something is queued, instead of looking by itself.
+  // Whether the thread waits until something is queued, instead of looking by itself: a snapshot, possibly stale.
   [[nodiscard]] bool sleeps() const { return sleeping_.load(); }
 
  private:

@@ -59,7 +59,7 @@ class MessageRing {
     }
   }
 
-  // Of the moment; any thread.
+  // A snapshot, possibly stale. Any thread.
   [[nodiscard]] size_t size() const {
     const size_t head = head_.load(std::memory_order_relaxed);
     const size_t tail = tail_.load(std::memory_order_relaxed);

@@ -143,8 +143,8 @@ class Session {
       connections_{0}, waitedTooLong_{0}, replayFailed_{0}, sentUnconfigured_{0};
   Standing standing_;
   Mutex overflowMutex_;
-  std::deque<std::unique_ptr<Command>> overflow_
-      GUARDED_BY(overflowMutex_);  // commands that found the ring full
+  // Commands that found the ring full.
+  std::deque<std::unique_ptr<Command>> overflow_ GUARDED_BY(overflowMutex_);
   std::atomic<size_t> overflowed_{0};
   Mutex stateMutex_;
   std::condition_variable stateChanged_;

@@ -12,8 +12,8 @@ namespace kyt {
 
 namespace {
 
-constexpr Duration kPollPeriod =
-    std::chrono::milliseconds(5);  // of what has no event of its own, at the end only
+// How often the shut-down looks at what gives no event of its own.
+constexpr Duration kPollPeriod = std::chrono::milliseconds(5);
 constexpr Duration kCancelGrace = std::chrono::seconds(1);  // for what was cancelled to call its completions
 
 WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log, const UserBudget& budget) {

@@ -111,8 +111,8 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   ProcessTransaction& transaction_;
 
   Monitor monitor_;
-  std::map<uint64_t, std::shared_ptr<ReportingdSession>> _sessionList
-      GUARDED_BY(monitor_);                                                             // in creation order
+  // By number, thus in the order of creation.
+  std::map<uint64_t, std::shared_ptr<ReportingdSession>> _sessionList GUARDED_BY(monitor_);
   std::unordered_map<const ReportingdSession*, uint64_t> places_ GUARDED_BY(monitor_);  // in the list
   uint64_t nextPlace_ GUARDED_BY(monitor_) = 0;
   SessionCensus census_ GUARDED_BY(monitor_);

@@ -56,9 +56,9 @@ class Database {
   Database& operator=(const Database&) = delete;
 
   bool execute(const char* sql);
-  // A statement that could not be prepared answers no rows.
+  // A statement that could not be prepared has no rows.
   [[nodiscard]] Statement prepare(std::string_view sql);
-  [[nodiscard]] int64_t number(std::string_view sql);  // the one number that a query answers, or 0
+  [[nodiscard]] int64_t number(std::string_view sql);  // the one number that a query returns, or 0
   [[nodiscard]] int64_t lastInsertedRow() const;
 
  private:

@@ -1,4 +1,4 @@
-// Writes the JSON that the query interface answers: a thin layer over RapidJSON's writer that takes string
+// Writes the JSON that the query interface returns: a thin layer over RapidJSON's writer that takes string
 // views and makes every text valid UTF-8, whatever a client sent. Used by one thread at a time.
 #pragma once
 

@@ -23,8 +23,8 @@
 namespace kyt::devserver {
 
 struct Totals {
-  int64_t posts = 0, bad = 0, events = 0, fetches = 0, lines = 0,
-          logs = 0;  // since the store was made or cleared
+  // Since the store was made or cleared.
+  int64_t posts = 0, bad = 0, events = 0, fetches = 0, lines = 0, logs = 0;
 };
 
 // What one transaction wrote.

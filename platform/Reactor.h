@@ -24,8 +24,8 @@ namespace kyt {
 namespace ready {
 inline constexpr unsigned readable = 1;
 inline constexpr unsigned writable = 2;
-inline constexpr unsigned ended =
-    4;  // the peer sends no more (reported with `readable`), or is gone (always reported)
+// The peer sends no more (reported with `readable`), or is gone (always reported).
+inline constexpr unsigned ended = 4;
 inline constexpr unsigned failed = 8;     // an error waits in the socket (always reported)
 inline constexpr unsigned priority = 16;  // out-of-band data, or what the descriptor's kind uses it for
 // How to report; these never come to a handler.

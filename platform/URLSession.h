@@ -34,21 +34,21 @@ inline constexpr int32_t kURLErrorOutstandingTooMuch = -1002;  // see URLSession
 struct URLRequest {
   std::string method = "GET";
   std::string url;
-  std::vector<std::pair<std::string, std::string>>
-      headers;  // sent in this order; control characters are removed
+  // Sent in this order; control characters are removed.
+  std::vector<std::pair<std::string, std::string>> headers;
   Data body;
   std::optional<Duration> timeout;  // from start to end, progress or not; none: only the no-progress time-out
   bool allowsCellularAccess = true;
-  bool isAwaited =
-      false;  // a thread does nothing else until it completes; see URLSessionFactory::cancelAwaited
+  // A thread does nothing else until it completes; see URLSessionFactory::cancelAwaited.
+  bool isAwaited = false;
   std::shared_ptr<UserAccount> account;  // of the client's user; null: the daemon's own request
   int maxRedirects = 0;                  // followed only while they stay on https
 };
 
 struct URLResponse {
   int status = 0;
-  std::vector<std::pair<std::string, std::string>>
-      headers;  // of the last response, in order, names as received
+  // Of the last response, in order, names as received.
+  std::vector<std::pair<std::string, std::string>> headers;
   // The value of that name, compared without case; of several lines of it all values, with ", " between them.
   [[nodiscard]] std::optional<std::string> header(std::string_view name) const;
 };
@@ -59,8 +59,8 @@ using URLCompletion = Function<void(std::optional<Data>, std::optional<URLRespon
 
 struct URLSessionConfiguration {
   std::string sourceApplication;  // sent as X-KYT-Source-Application; empty: not sent
-  bool waitsForConnectivity =
-      false;  // a request that cannot leave (no route, no resolver) waits for the network
+  // A request that cannot leave (no route, no resolver) waits for the network.
+  bool waitsForConnectivity = false;
 };
 
 // What the requests of one session that have not completed count, for those who implement the port: each user's apart,

@@ -26,8 +26,8 @@ class UserDefaults {
   // A null value removes the key. Replaces the file atomically; an error leaves what was there.
   [[nodiscard]] virtual std::optional<Error> set(std::string_view domain, std::string_view key,
                                                  Value value) = 0;
-  // Stores `value` unless the key already has a string; answers what is stored afterwards, also under concurrent
-  // callers of other processes. On an error answers `value`, unstored (counted and logged by the adapter). `owner` is the
+  // Stores `value` unless the key already has a string; returns what is stored afterwards, also under concurrent
+  // callers of other processes. On an error returns `value`, unstored (counted and logged by the adapter). `owner` is the
   // user for whose client it is made, who has a share of the identifiers that are kept; none: the daemon's own.
   [[nodiscard]] virtual String stringOrStore(std::string_view domain, std::string_view key, String value,
                                              std::optional<uint32_t> owner) = 0;

@@ -20,8 +20,8 @@
 
 namespace kyt {
 
-// `list` may be null: a missing list. An empty or missing list answers `whitelist`, a missing string the
-// opposite; otherwise whether some element equals the string. An empty element matches nothing.
+// `list` may be null: a missing list. Returns `whitelist` for an empty or missing list, the opposite for a missing
+// string; otherwise whether some element equals the string. An empty element matches nothing.
 [[nodiscard]] bool matchExactStringWithList(const Array* list, const String* wholeString, bool whitelist);
 // The same, but whether the string contains some element.
 [[nodiscard]] bool matchStringWithList(const Array* list, const String* wholeString, bool whitelist);
@@ -45,7 +45,7 @@ class EventFilters {
     int32_t method = -1;  // negative: any
     int32_t status = -1;  // negative: any
     Action action = Action::keep;
-    std::optional<std::string> foldedKey;  // none: takes its place in the table and is about no key
+    std::optional<std::string> foldedKey;  // none: counted, but matches nothing
     UnfoldedSizes sizes;                   // of the keys that fold to it
     uint32_t ends = 0;                     // of it; keys with ASCII ends have the same
   };
@@ -59,7 +59,7 @@ class EventFilters {
 
   std::vector<Filter> filters_;
   bool asksMethod_ = false, asksStatus_ = false;  // whether some filter is bound to one
-  std::bitset<kShapes> keyShapes_;                // those that the filters' keys have (EventFilters.cpp)
+  std::bitset<kShapes> keyShapes_;                // of the filters' keys (EventFilters.cpp)
 };
 
 }  // namespace kyt

@@ -30,7 +30,7 @@ enum class Reason : uint8_t {
   messageTooLong,
   tooManyConnections,
   tooManyConnectionsOfUser,
-  tooManyDescriptorsOfUser,  // a connection refused, or ended with those that its message brought
+  tooManyDescriptorsOfUser,  // a connection refused, or ended with its message's descriptors
   userBytesExceeded,    // a connection or hierarchy token that its user's share of memory has no room for
   queuedBytesExceeded,  // reading from a client stopped
   clientNotReading,     // … and its connection ended

@@ -57,10 +57,10 @@ struct Limits {
   static constexpr double handshakeSeconds = 30;
   static constexpr double messageSeconds = 30;  // once begun; it keeps memory and descriptors until its end
   static constexpr size_t maxDescriptorsPerMessage = 16;
-  static constexpr size_t connectionBytes =
-      32768;  // what a connection and its session count, before they hold anything
-  static constexpr size_t socketBytes =
-      212992;  // … and more, while its client lets the socket's buffer be full
+  // What a connection and its session count, before they hold anything.
+  static constexpr size_t connectionBytes = 32768;
+  // … and this more while the socket's buffer is full, since its client does not read.
+  static constexpr size_t socketBytes = 212992;
   static constexpr size_t freeBytes = 4096;      // what each may hold besides: counted with the connection
   static constexpr unsigned turnCalls = 256;     // a connection hands its worker back after so many calls
   static constexpr size_t turnBytes = 1u << 20;  // … or so many bytes

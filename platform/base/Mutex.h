@@ -1,9 +1,9 @@
 // The locks of this project, annotated so that clang's thread-safety analysis can check every guarded field. Serial queues
 // (platform/queues/SerialQueue.h) are annotated with the same macros.
 //
-// `Mutex` is for the few private, short critical sections. `Monitor` is the recursive lock tied to an object (the
-// agent's lock): who holds it may call operations that take it again. Both may be used from any thread; neither
-// performs a system call unless there is contention. The order of locks is stated in docs/THREADS.md.
+// `Mutex` is for the few private, short critical sections. `Monitor` is the recursive lock of an object (the agent): a
+// thread that holds it may call operations that take it again. Any thread may use both; neither makes a system call
+// without contention. docs/THREADS.md has the order of locks.
 #pragma once
 
 #include <mutex>
@@ -37,7 +37,7 @@ class CAPABILITY("mutex") Mutex {
   void lock() ACQUIRE() { mutex_.lock(); }
   void unlock() RELEASE() { mutex_.unlock(); }
   [[nodiscard]] bool tryLock() TRY_ACQUIRE(true) { return mutex_.try_lock(); }
-  // For std::condition_variable_any-free waiting: ConditionVariable (ConditionVariable.h) uses it.
+  // For ConditionVariable (ConditionVariable.h) alone, which waits with it.
   std::mutex& native() { return mutex_; }
 
  private:

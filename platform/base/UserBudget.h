@@ -25,8 +25,8 @@ struct Limits;
 
 enum class Share : uint8_t {
   // Counted in the user's account.
-  connections,  // those that are ending included
-  descriptors,  // of connections, and those that came with messages and wait for the rest of them
+  connections,  // ending ones included
+  descriptors,  // of connections, and of messages that are not complete yet
   // Memory: connections, half messages, replies to the client and of servers, session information, batches, posts,
   // datagrams, hierarchies.
   bytes,

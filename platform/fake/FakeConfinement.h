@@ -1,4 +1,4 @@
-// Remembers the profiles that were asked for, and answers the error that a test gave it.
+// Remembers the profiles that were asked for, and returns the error that a test gave it.
 #pragma once
 
 #include <optional>

@@ -48,8 +48,8 @@ class FakeURLSessionFactory final : public URLSessionFactory {
   // Preconditions of all that take an index: index < requestCount().
   [[nodiscard]] URLRequest request(size_t index) const;
   [[nodiscard]] URLRequest lastRequest() const;
-  [[nodiscard]] URLSessionConfiguration configurationOf(
-      size_t index) const;                             // of the session that started it
+  // Of the session that started it.
+  [[nodiscard]] URLSessionConfiguration configurationOf(size_t index) const;
   [[nodiscard]] size_t sessionOf(size_t index) const;  // numbered in the order of create()
   [[nodiscard]] bool isOpen(size_t index) const;       // neither answered nor cancelled
   // The value of a header of a request, compared with case; no value when it has none of that name.

@@ -16,10 +16,10 @@ class FaultyDeflate : public Deflate {
   struct Faults {
     std::optional<int> initialize;  // the result of initialize(), which then does nothing else
     std::deque<int> finish;         // the results of the next calls of finish(), which then do nothing else
-    std::optional<size_t> bound;    // what bound() answers
+    std::optional<size_t> bound;    // what bound() returns
     Function<void()> beforeFinish;  // called by each finish()
-    const char* message = nullptr;  // what message() answers, if not null
-    bool noStream = false;          // newStream() answers null
+    const char* message = nullptr;  // what message() returns, if not null
+    bool noStream = false;          // newStream() returns null
   };
   struct Calls {
     int streams = 0;

@@ -12,7 +12,7 @@ namespace kyt {
 
 class FixedRandom : public RandomSource {
  public:
-  // Every draw answers this (modulo its bound) unless draws are queued.
+  // Every draw returns this (modulo its bound) unless draws are queued.
   explicit FixedRandom(uint32_t draw = 0) : draw_(draw) {}
 
   [[nodiscard]] uint32_t uniform(uint32_t bound) override;

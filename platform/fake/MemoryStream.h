@@ -21,8 +21,8 @@ struct MemoryPipe {
   bool ended = false;      // the client sends no more, once toServer is empty
   bool closed = false;     // the server has closed its end
   size_t writes = 0, reads = 0;
-  int passed =
-      0;  // descriptors that come with the next read: numbers from 1000, closed into `closedDescriptors`
+  // Descriptors that come with the next read: numbers from 1000, closed into `closedDescriptors`.
+  int passed = 0;
   PeerCredentials credentials;
   static inline int closedDescriptors = 0;
 };

@@ -3,7 +3,7 @@
 //
 // The caller compares the message's signature with the one it expects first (`hasSignature`), then reads the
 // arguments in order, each with the function for its type, then asks `finish()`. Reading stops at the first
-// failure: every later read answers false and leaves its target as it was.
+// failure: every later read returns false and leaves its target as it was.
 //
 // Objects inside variants: b boolean; y q u t unsigned; n i x signed; d double; s o g strings; ay data; (d) a
 // date; a{s*} a dictionary; any other array an array. Of equal keys the last wins. What the protocol admits

@@ -33,7 +33,7 @@ class ClientSessionDispatcher {
   struct Peer {
     ClientSessionInterface& session;
     const std::shared_ptr<ConnectionOutput>& output;
-    std::span<Descriptor> descriptors;  // those that came with the message; the session may take them
+    std::span<Descriptor> descriptors;  // of the message; the session may take them
     uint64_t connectionNumber;          // the unique name is ":1.N"
     Stream* stream = nullptr;           // asked who the client is when a call needs its rights; none: nobody
   };

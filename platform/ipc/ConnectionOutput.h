@@ -58,7 +58,7 @@ class ConnectionOutput {
   };
   // Writes one whole message.
   Sent send(Builder build, Kind kind = Kind::ordinary);
-  // The handshake's answers, which come before every message: those that are sent earlier wait for open().
+  // The handshake's answers, which go before every message: a message that is sent earlier waits for open().
   void sendHandshake(std::string_view bytes);
   void open();
 

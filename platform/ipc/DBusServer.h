@@ -30,7 +30,7 @@ class DBusServer final : public Listener {
   // more when it returns, and what was accepted is counted. Not from the listener's or a connection's queue.
   void pauseAccepting();
   void resumeAccepting();
-  // How many connections exist, those that are ending included. Any thread.
+  // The number of connections, ending ones included. Any thread.
   [[nodiscard]] size_t connectionCount() const { return context_->connectionCount(); }
   // The deadline of a shut-down: invalidates every connection that is left.
   void invalidateConnections();

@@ -176,8 +176,8 @@ Frame malformed(const char* problem) {
 }  // namespace
 
 const char* HeaderMemory::parse(const uint8_t* header, size_t end, Message& message) {
-  constexpr size_t kFields =
-      12;  // before them: flags, length of the body and serial differ, order and type must not
+  // Where the fields begin. Before them flags, length of the body and serial may differ, order and type not.
+  constexpr size_t kFields = 12;
   if (end > sizeof bytes_) return parseHeader(header, end, message);
   if (end != end_ || std::memcmp(header + kFields, bytes_ + kFields, end - kFields) != 0 ||
       message.type != message_.type || message.swapped != message_.swapped) {

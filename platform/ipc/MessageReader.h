@@ -54,7 +54,7 @@ class HeaderMemory {
   HeaderMemory(const HeaderMemory&) = delete;
   HeaderMemory& operator=(const HeaderMemory&) = delete;
 
-  // Fills in what the fields of the header say, which ends at `end`; answers what is wrong with it, or null.
+  // Fills in what the fields of the header say, which ends at `end`; returns what is wrong with it, or null.
   // `message` has its type and byte order.
   [[nodiscard]] const char* parse(const uint8_t* header, size_t end, Message& message);
 

@@ -1,7 +1,7 @@
 // The steps of reading a body: aligned numbers, texts, signatures, arrays' bounds. BodyReader and WireValues are made of
 // them.
 //
-// Each answers false at the first failure and leaves its reason in the cursor, whose status every reader looks at first.
+// Each returns false at the first failure and leaves its reason in the cursor, whose status every reader looks at first.
 // They check bounds, zero padding and UTF-8 whatever the bytes are.
 #pragma once
 

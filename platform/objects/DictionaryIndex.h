@@ -26,8 +26,8 @@ struct IndexBlock {
 
 inline constexpr uint32_t kNotFound = UINT32_MAX;
 
-[[nodiscard]] uint32_t findInIndex(DictionaryBlock& block,
-                                   std::string_view key) noexcept;  // position or kNotFound
+// Position or kNotFound.
+[[nodiscard]] uint32_t findInIndex(DictionaryBlock& block, std::string_view key) noexcept;
 // Before the entry at position block.size is made: enters it, making or growing the index when needed.
 void addToIndex(DictionaryBlock& block, std::string_view key);
 // Before the entry at that position is removed: the later ones move down by one. Frees the index when few are

@@ -231,8 +231,8 @@ class KYT_OBJECT Dictionary {
   [[nodiscard]] Value take(std::string_view key) noexcept;
   bool remove(std::string_view key);    // whether it was there
   void merge(const Dictionary& other);  // set() of each entry of other, in its order
-  // Entries whose predicate (const String& key, Value& value) -> bool answers true are removed; the value may
-  // be assigned to in the predicate. Unshares the block at the first call.
+  // Removes the entries for which the predicate (const String& key, Value& value) -> bool returns true; it may assign to
+  // the value. Unshares the block at the first call.
   template <typename Predicate>
   void removeIf(Predicate&& predicate);
   [[nodiscard]] const void* block() const noexcept { return block_; }
@@ -243,8 +243,8 @@ class KYT_OBJECT Dictionary {
 
  private:
   friend class Value;
-  const Value* findInline(
-      const detail::Cell& key) const noexcept;  // of a small dictionary, a key without a block
+  // Of a small dictionary, a key without a block.
+  const Value* findInline(const detail::Cell& key) const noexcept;
   const Value* findSlowly(std::string_view key) const noexcept;
   void appendSlowly(String key, Value value);  // grows, unshares, or keeps the index
   DictionaryEntry* mutableEntries();           // unshares

@@ -45,8 +45,8 @@ inline constexpr uint32_t kMaxScanned = 32;          // entries of a dictionary 
 inline constexpr uint32_t kPermanent = 0x80000000U;  // the bit of a count that is not counted
 inline constexpr size_t kMaxInlineText = 15;
 
-void destroyBlock(Block* block,
-                  uint8_t tag) noexcept;  // frees a block without owners and releases what it refers to
+// Frees a block without owners and releases what it refers to.
+void destroyBlock(Block* block, uint8_t tag) noexcept;
 
 inline void retainBlock(Block* block) noexcept {
   if ((block->references.load(std::memory_order_relaxed) & kPermanent) == 0)

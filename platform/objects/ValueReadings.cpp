@@ -56,8 +56,8 @@ uint64_t unsignedOfText(std::string_view text) {
 
 double realOfText(std::string_view text) {
   const bool negative = takeBlanksAndSign(text);
-  if (text.empty() || !(isDigit(text.front()) || text.front() == '.'))
-    return 0;  // "inf" and "nan" are no digits
+  // "inf" and "nan" are no digits.
+  if (text.empty() || !(isDigit(text.front()) || text.front() == '.')) return 0;
   double number = 0;
   const auto result = std::from_chars(text.data(), text.data() + text.size(), number);
   if (result.ec == std::errc::result_out_of_range)

@@ -1,10 +1,9 @@
-// The structured log. Three levels; every line begins with the operation that writes it. Texts are printf
-// formats, checked by the compiler. Lines below the level in force cost one relaxed load.
+// The structured log. It has three levels. Every line begins with the operation that writes it. Texts are printf
+// formats, which the compiler checks. A line below the level in force costs one relaxed load.
 //
-// A `Log` may be called from any thread, never fails and never throws. What came from outside (a client's
-// name, a server's reply) may hold anything, at any length: the sinks escape control characters and invalid
-// UTF-8, and a line longer than Limits::maxLogLineBytes is cut there and says so. Owned by the composition
-// root; everyone else holds a reference.
+// Any thread may call a `Log`; it never fails and never throws. A text from outside (a client's name, a server's reply)
+// may hold anything, at any length: the sinks escape control characters and invalid UTF-8, and cut a line at
+// Limits::maxLogLineBytes and say so. The composition root owns the log; everyone else holds a reference.
 #pragma once
 
 #include <atomic>
@@ -20,16 +19,16 @@ class LineLimits;
 
 enum class LogLevel : int {
   debug = 0,
-  normal = 1,
+  normal = 1,  // "default" in settings and on the command line
   error = 2
-};  // "default" in settings and on the command line
+};
 
 // Where lines go: journald, standard error, or a test's memory. Called from any thread, concurrently.
 class LogSink {
  public:
   virtual ~LogSink() = default;
   virtual void write(LogLevel level, std::string_view line) = 0;
-  // Before this it starts no thread. Once, when the process is confined.
+  // Called once, when the process is confined; before that a sink starts no thread.
   virtual void allowThreads() {}
 };
 
@@ -44,7 +43,8 @@ class Log {
   // Only before other threads exist.
   void setSink(LogSink& sink) { sink_ = &sink; }
   void allowThreads() { sink_->allowThreads(); }
-  // Asked before each line above the debug level that a thread writes for a client (ClientScope); null: nobody.
+  // The log asks these limits before each line above the debug level that a thread writes for a client (ClientScope).
+  // Null: no limits.
   void setLineLimits(LineLimits* limits) { lineLimits_.store(limits, std::memory_order_release); }
   [[nodiscard]] bool enabled(LogLevel level) const {
     return static_cast<int>(level) >= level_.load(std::memory_order_relaxed);

@@ -33,8 +33,8 @@ bool Semaphore::waitFor(Duration timeout) {
 void Semaphore::signal() {
   MutexLock lock(mutex_);
   ++value_;
-  changed_
-      .notifyOne();  // under the lock: the waiter cannot return, and end the semaphore, before this is done
+  // Under the lock: the waiter cannot return, and end the semaphore, before this is done.
+  changed_.notifyOne();
 }
 
 }  // namespace kyt

@@ -1,21 +1,18 @@
 // Serial task queues: work runs one piece at a time in the order it was submitted, whatever threads run it.
 // Every stateful object of the daemon belongs to one.
 //
-// - async(): the work runs later. On a thread that is inside a Turn (a connection's worker handling what its
-// client
-//   sent) an idle queue wakes no other thread: the turn runs the queue at its end at the latest. Elsewhere
-//   the executor is asked for a worker.
-// - sync(): runs the work before returning, on the caller's own thread. Waits while another thread is running
-// the
-//   queue; work that was submitted earlier and has not begun is run first, by the caller itself. On an idle
-//   queue it costs one uncontended atomic exchange each way. A synchronous call from a queue onto itself is a
-//   bug and is asserted.
+// - async(): the work runs later. On a thread inside a Turn (a connection's worker that handles its client's calls) an
+//   idle queue wakes no other thread: the turn runs the queue at its end at the latest. Elsewhere the executor gives
+//   it a worker.
+// - sync(): runs the work on the caller's thread and returns after it. Waits while another thread runs the queue.
+//   Runs earlier work that has not begun first. On an idle queue it costs one uncontended atomic exchange each way.
+//   A call from a queue onto itself is a bug: it ends the program with a line.
 //
-// Work holds no lock of the queue while it runs. Callable from any thread. A queue is kept alive by its owner
-// and by pending work; work that is pending when the executor has shut down is destroyed unrun. Small on
-// purpose: an idle queue is one block of at most 96 bytes, since every back end of every session has one.
+// Any thread may call both. Work runs without a lock of the queue. The owner and pending work keep a queue alive. Work
+// that is pending when the executor has shut down is destroyed unrun. An idle queue is one block of at most 96 bytes,
+// since every back end of every session has one.
 //
-// Whoever owns a queue says what it guards, and clang's analysis refuses every other use: fields are GUARDED_BY(*queue_),
+// The owner of a queue says what it guards, and clang's analysis refuses every other use: fields are GUARDED_BY(*queue_),
 // functions that run on the queue REQUIRES(*queue_), and each piece of work that is handed to it begins with
 // assertCurrent().
 #pragma once
@@ -121,7 +118,7 @@ class Turn {
   Turn& operator=(const Turn&) = delete;
   void runDeferred();
   static Turn* current() noexcept;  // the outermost one of this thread; null outside
-  // The first deferred queue, for who runs or submits it otherwise; null when there is none.
+  // Takes the first deferred queue out of the turn, for a caller that runs or submits it; null when there is none.
   [[nodiscard]] std::shared_ptr<SerialQueue> takeFirst();
   // Also calls what setBeforeBlocking() was given, so that nobody waits for what this turn holds back.
   void handDeferredToExecutors();

@@ -86,8 +86,8 @@ class WorkerPool::Implementation {
   size_t mostOfOneOwner_;
 
   Mutex mutex_;
-  std::vector<std::unique_ptr<Worker>> slots_
-      GUARDED_BY(mutex_);                         // those of workers that ended are used again
+  // Those of workers that ended are used again.
+  std::vector<std::unique_ptr<Worker>> slots_ GUARDED_BY(mutex_);
   std::vector<Worker*> idle_ GUARDED_BY(mutex_);  // asleep; the last one is woken first
   OwnerLines ready_ GUARDED_BY(mutex_);
   std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their half

@@ -30,7 +30,7 @@ class TemporaryFolder {
 
   [[nodiscard]] const std::string& path() const { return path_; }
   [[nodiscard]] std::string operator/(std::string_view name) const { return path_ + "/" + std::string(name); }
-  // Writes a file (its folders are made) and answers its path.
+  // Writes a file (its folders are made) and returns its path.
   std::string write(std::string_view name, std::string_view bytes, mode_t mode = 0644) const {
     const std::string file = *this / name;
     std::filesystem::create_directories(std::filesystem::path(file).parent_path());

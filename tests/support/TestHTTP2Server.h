@@ -66,8 +66,8 @@ class TestHTTP2Server {
   struct Options {
     TestCertificate certificate;
     uint32_t streams = 100;  // that its first settings allow
-    std::function<bool(Connection&)> greet =
-        nullptr;  // before anything; false: that is all this side says by itself
+    // Called before anything; false: this side says nothing more by itself.
+    std::function<bool(Connection&)> greet = nullptr;
   };
 
   explicit TestHTTP2Server(Options options);

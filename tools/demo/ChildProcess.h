@@ -53,7 +53,7 @@ class ChildProcess {
   std::optional<int> status_;
 };
 
-// Asks until it answers true, at most `timeout` of real time.
+// Asks until it returns true, at most `timeout` of real time.
 template <typename Condition>
 [[nodiscard]] bool waitUntil(std::chrono::milliseconds timeout, Condition&& condition);
 

@@ -151,8 +151,8 @@ std::optional<Error> Stage::handOverFolders() {
   std::error_code error;
   fs::create_directories(logs, error);
   if (error) return failure(logs + ": " + error.message());
-  const std::string above =
-      options_.folder + "/var/mobile/Library/Logs/Faultbin";  // the former is made again in it
+  // The former is made again in it.
+  const std::string above = options_.folder + "/var/mobile/Library/Logs/Faultbin";
   if (chown(above.c_str(), static_cast<uid_t>(-1), options_.daemonUser->group) != 0 ||
       chmod(above.c_str(), 01775) != 0)
     return failure(above + ": " + std::strerror(errno));

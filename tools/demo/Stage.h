@@ -1,7 +1,6 @@
-// A private place where the daemon and the development server run together: a folder that stands for the file
-// system's root, with keys, settings, entitlements, device properties, consent and signed storebags. Used by
-// the demonstration
-// (`./kyt run`), by the tests of the whole daemon and by the benchmarks. One thread.
+// A private place where the daemon and the development server run together: a folder that stands for the file system's
+// root, with keys, settings, entitlements, device properties, consent and signed storebags. The demonstration
+// (`./kyt run`), the tests of the whole daemon and the benchmarks use it. One thread.
 #pragma once
 
 #include <chrono>
@@ -30,8 +29,7 @@ class Stage {
     std::string extraSettings;                 // appended to kytreportingd.toml
     std::vector<std::string> serverArguments;  // further ones for the development server
     bool keepFolder = false;
-    // As in an installation, where the daemon has a user of its own and its clients have theirs; both are this process's
-    // when none are given. Others need root.
+    // The users of the daemon and of its clients; none: this process's own. Another user needs root.
     std::optional<User> daemonUser, clientUser;
   };
   // The folder laid out, the development server running. The daemon is started by startDaemon().

@@ -54,7 +54,7 @@ class Refusal {
 // "no daemon listens at PATH: REASON" when nobody takes a connection there now, or none.
 [[nodiscard]] std::optional<std::string> noDaemon(const ConnectionOptions& connection);
 
-// Says that `what` failed, and why; answers 1. The text stands unless nobody listens.
+// Says that `what` failed, and why; returns 1. The text stands unless nobody listens.
 int failedCall(const ConnectionOptions& connection, const std::string& what, const std::string& text);
 
 // Waits, and prints the answer; 0 when there was one. Texts that are empty are not printed.

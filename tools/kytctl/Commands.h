@@ -1,4 +1,4 @@
-// The commands of kytctl: each takes what the command line said and answers the exit status: 0 done, 1 it
+// The commands of kytctl: each takes what the command line said and returns the exit status: 0 done, 1 it
 // could not be done (with a line on standard error), 2 wrong usage. Output for people and scripts goes to
 // standard output.
 #pragma once
@@ -60,7 +60,7 @@ struct CheckOptions {
 // With a public key the signature is checked first.
 [[nodiscard]] int showCommand(const std::string& document, const std::string& publicKey);
 
-// "kytctl: TEXT" on standard error, with control characters escaped; answers 1.
+// "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);
 int failed(const std::string& text);
 

@@ -13,8 +13,8 @@ namespace kyt::tools {
 
 namespace {
 
-constexpr uint64_t kQueued =
-    1024;  // messages that a script lets wait, well below what a session's queue holds
+// Messages that a script lets wait, well below what a session's queue holds.
+constexpr uint64_t kQueued = 1024;
 constexpr int64_t kLast16 = 65535, kLast31 = 2147483647, kLast32 = 4294967295;
 
 KeyRule number(std::string_view name, int64_t most, bool required = false) {

@@ -21,7 +21,7 @@
 // was written, when no daemon took it within Options::callDeadline, or when the session closes first.
 // Ownership: arguments are copied (objects share their contents, copying costs a pointer).
 // Errors: values; nothing throws but std::bad_alloc.
-// Fork: in a child process made by fork() the sessions of the parent are inert: sending answers false.
+// Fork: in a child process made by fork() the sessions of the parent are inert: sending returns false.
 // Exit: a process may end at any time; `finish()` first, if what is queued matters.
 //
 // Link with -lkytreporting (pkg-config kytreporting; CMake kytreporting::kytreporting).
@@ -54,8 +54,8 @@ struct Command;
 // The domain of errors that the library itself gives, and their codes.
 inline constexpr char kKYTReportingClientErrorDomain[] = "KYTReportingClientErrorDomain";
 enum class ClientError : int32_t {
-  notConnected =
-      1,          // the connection ended before the answer, or there is no daemon (the description says why)
+  // The connection ended before the answer, or there is no daemon (the description says why).
+  notConnected = 1,
   closed = 2,     // the session was closed, or belongs to the parent of this process
   queueFull = 3,  // the bounded queue had no room
   refused = 4,    // the daemon answered with an error (the description has its text)
@@ -139,14 +139,14 @@ class KYT_EXPORT KYTReporting {
   struct Statistics {
     uint64_t sent = 0;              // messages written to the daemon's socket
     uint64_t droppedQueueFull = 0;  // refused by sendMessage because the queue was full
-    uint64_t lostOnConnectionEnd =
-        0;                        // written or queued, but their connection ended before the daemon took them
-    uint64_t droppedClosed = 0;   // sent after close, or in a child process
-    uint64_t droppedInvalid = 0;  // could not be encoded, or their session's information is wrong
-    uint64_t connections = 0;     // connections made, the first included
-    uint64_t queued = 0;          // in the queue now
-    uint64_t waitedTooLong = 0;   // calls whose completion waited for a daemon until the deadline
-    uint64_t replayFailed = 0;    // values that a daemon that came back could not be told again
+    // Written or queued, but their connection ended before the daemon took them.
+    uint64_t lostOnConnectionEnd = 0;
+    uint64_t droppedClosed = 0;     // sent after close, or in a child process
+    uint64_t droppedInvalid = 0;    // could not be encoded, or their session's information is wrong
+    uint64_t connections = 0;       // connections made, the first included
+    uint64_t queued = 0;            // in the queue now
+    uint64_t waitedTooLong = 0;     // calls whose completion waited for a daemon until the deadline
+    uint64_t replayFailed = 0;      // values that a daemon that came back could not be told again
     uint64_t sentUnconfigured = 0;  // sent before startConfiguration: the daemon dropped them
   };
 

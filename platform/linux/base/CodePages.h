@@ -8,7 +8,7 @@ namespace kyt {
 
 // Gives back the read-only pages of the program and of all its libraries; those in use come back from the
 // page cache at their next use. Called once the program has started, and again when much was loaded. Any
-// thread, while others run. A debugger's breakpoints in the pages are lost, as is a probe's. Answers the
+// thread, while others run. A debugger's breakpoints in the pages are lost, as is a probe's. Returns the
 // number of bytes whose pages were given back, resident or not.
 size_t giveBackCodePages();
 

@@ -11,8 +11,8 @@
 namespace kyt {
 namespace {
 
-constexpr int kMost =
-    1 << 20;  // the most that a process may have, unless an administrator changed the system's limit
+// The most that a process may have, unless an administrator changed the system's limit.
+constexpr int kMost = 1 << 20;
 
 // A descriptor with a high number makes the table as large as that; it goes at once, the table stays.
 void makeRoom(int count) {

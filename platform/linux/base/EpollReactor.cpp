@@ -1,11 +1,12 @@
 // What handlers and timers give to queues is gathered while one batch of events is handled. At a quiet rate
 // the first few of these queues are then run right here; the others go to their executors.
 //
-// One mutex guards registrations and timers; it is never held while a handler runs or a queue is given work. Nor while a
-// watch is changed, for which each registration has a mutex of its own: what is asked for is often ready already, and
-// the reactor's thread, awake at once, would have to wait for who asked.
-// An event carries the number of its slot and the slot's generation, so that one harvested before its watch
-// was destroyed finds nothing.
+// One mutex guards registrations and timers. No thread holds it while a handler runs, while a queue is given work, or
+// while a watch is changed. A change of a watch takes the mutex of its registration instead: the descriptor is often
+// ready already, which wakes the reactor's thread at once, and that thread must not wait for the caller.
+//
+// An event carries the number of its slot and the slot's generation. An event that was read before its watch was
+// destroyed therefore finds nothing.
 #include "platform/linux/base/EpollReactor.h"
 
 #include <errno.h>
@@ -255,8 +256,8 @@ void EpollReactor::Implementation::stop() {
   stopping_ = true;
   signalEventDescriptor(stopEvent_.get());
   threads_.stop();
-  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Timer::Work>>>
-      works;  // destroyed without the lock
+  // Destroyed without the lock.
+  std::vector<std::pair<std::shared_ptr<SerialQueue>, std::shared_ptr<Timer::Work>>> works;
   std::map<TimerKey, std::shared_ptr<Timer>> dropped;
   MutexLock lock(mutex_);
   for (auto& [key, timer] : timersByDue_) {

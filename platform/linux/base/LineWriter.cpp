@@ -37,8 +37,8 @@ struct LineWriter::State {
   [[nodiscard]] bool hasRoom() const {
     if (neverFull) return true;
     pollfd writable = {descriptor, POLLOUT, 0};
-    return ::poll(&writable, 1, 0) >
-           0;  // also where it is closed or no reader is left: then writing fails at once
+    // True also where it is closed or has no reader left: then writing fails at once.
+    return ::poll(&writable, 1, 0) > 0;
   }
   // What is left of the line: it stops where writing would wait. What fails is lost, unless somebody else can take it.
   [[nodiscard]] std::string_view writeWhatHasRoom(const std::string& line) const REQUIRES(mutex) {

@@ -29,9 +29,9 @@ struct LineWriterOptions {
 
 class LineWriter {
  public:
-  LineWriter(int descriptor,
-             LineWriterOptions options);  // the descriptor stays the caller's, and open, but see above
-  ~LineWriter();                          // waits for what is queued, a second at most
+  // The caller keeps the descriptor, and keeps it open; but see above.
+  LineWriter(int descriptor, LineWriterOptions options);
+  ~LineWriter();  // waits for what is queued, a second at most
   LineWriter(const LineWriter&) = delete;
   LineWriter& operator=(const LineWriter&) = delete;
 

@@ -57,7 +57,7 @@ class WakeUp {
 class WaitSet {
  public:
   void clear();
-  size_t add(int fd, bool writable);  // always also for readable; answers the index
+  size_t add(int fd, bool writable);  // always also for readable; returns the index
   // Waits for any of them, at most so long (negative: for ever).
   void wait(std::chrono::milliseconds timeout);
   [[nodiscard]] bool ready(size_t index) const;

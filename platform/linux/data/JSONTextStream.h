@@ -66,10 +66,10 @@ class JSONTextStream {
 
  private:
   static constexpr size_t kSize = 4096;
-  static constexpr size_t kSlack =
-      16;  // for the quotation marks, and since short ends are written as whole words
-  static constexpr size_t kPiece =
-      (kSize - kSlack) / 6;  // of a text: at most six characters are written for one
+  // For the quotation marks, and since short ends are written as whole words.
+  static constexpr size_t kSlack = 16;
+  // Of a text: at most six characters are written for one.
+  static constexpr size_t kPiece = (kSize - kSlack) / 6;
 
   // Whether one of eight characters must be escaped: below a blank, a quotation mark or a backslash.
   static bool anyEscaped(uint64_t word) {
@@ -86,7 +86,7 @@ class JSONTextStream {
     return word;
   }
 
-  // Writes the text and answers the end. It is copied by words as long as nothing in them is escaped; the
+  // Writes the text and returns the end. It is copied by words as long as nothing in them is escaped; the
   // last word overlaps the one before, and a text shorter than a word is put together from overlapping
   // pieces.
   static char* escaped(char* to, const char* from, size_t size) {

@@ -7,7 +7,7 @@
 // whatever crashes when, there is the old content or the new. Mode and, as far as this process may, owner and
 // group of the file are kept; a new file gets those of the folder and mode 0640.
 //
-// A file that may not be read, cannot be parsed or is not flat answers nothing, is counted and logged once for
+// A file that may not be read, cannot be parsed or is not flat has no values, is counted and logged once for
 // each of its states, and is never overwritten. What the machine refuses for a moment (FlatToml.h) changes nothing but
 // for a line. At most Limits::maxCustomIdentifiers keys "uuid:…" are
 // stored, each of at most kMaxIdentifierKey bytes, since clients choose their names; for one user's clients only some of

@@ -97,8 +97,8 @@ std::optional<std::string> makeFolders(const std::string& path, uint32_t mode) {
     const std::string parent = path.substr(0, slash);
     if (::mkdir(parent.c_str(), 0755) != 0 && errno != EEXIST) {
       const int error = errno;
-      struct stat status =
-          {};  // on a read-only or foreign parent mkdir may fail although the folder is there
+      // On a read-only or foreign parent mkdir may fail although the folder is there.
+      struct stat status = {};
       if (::stat(parent.c_str(), &status) != 0) return parent + ": " + errorText(error);
     }
   }

@@ -31,8 +31,8 @@ namespace kyt {
 // Any thread.
 class DeletionBroker {
  public:
-  static constexpr size_t kMaxGroups =
-      1024;  // supplementary groups of a client; one that has more is refused
+  // Supplementary groups of a client; one that has more is refused.
+  static constexpr size_t kMaxGroups = 1024;
   static constexpr size_t kMostOfOneUser = 32;  // removals at once; eight times as many of all
 
   // Only before there are threads and before the confinement. Nothing beneath `daemonsOwn` is ever removed: the folders

@@ -31,8 +31,8 @@ class JournalPowerLog final : public PowerLog {
   Counters& counters_;
   const size_t maxQueuedBytes_;
   Mutex mutex_;
-  std::unique_ptr<LineWriter> entries_
-      GUARDED_BY(mutex_);  // from the first event for which there was a journal
+  // From the first event for which there was a journal.
+  std::unique_ptr<LineWriter> entries_ GUARDED_BY(mutex_);
 };
 
 }  // namespace kyt

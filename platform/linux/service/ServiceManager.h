@@ -49,8 +49,8 @@ class LinuxProcessTransaction final : public ProcessTransaction {
  private:
   struct State;
   static void wait(const std::shared_ptr<State>& state);
-  const std::shared_ptr<State>
-      state_;  // shared with the timer's work, which may be on its way when this object ends
+  // Shared with the timer's work, which may be on its way when this object ends.
+  const std::shared_ptr<State> state_;
 };
 
 }  // namespace kyt

@@ -14,8 +14,8 @@ class CurlURLSession final : public URLSession {
     const size_t charge = OutstandingBytes::of(request);
     OutstandingBytes::User& user = state_->outstanding.user(request.account);
     const auto refusal = !user.take(charge) ? URLTransfer::Refusal::tooMuch : URLTransfer::Refusal::none;
-    if (refusal == URLTransfer::Refusal::tooMuch)
-      request = {};  // it is not kept until its completion has run
+    // It is not kept until its completion has run.
+    if (refusal == URLTransfer::Refusal::tooMuch) request = {};
     auto transfer = std::make_shared<URLTransfer>(state_, std::move(request), std::move(completion));
     transfer->user = &user;
     transfer->outstandingCharge = refusal == URLTransfer::Refusal::none ? charge : 0;

@@ -1,6 +1,6 @@
-// Which requests may be on their way: so many in all, and so many to one server, so that one that does not answer (each
-// request to it lasts a minute) leaves room for those to others. What may not go yet waits in its server's line; the
-// server with the fewest requests on their way comes first. Belongs to the network thread.
+// Decides which requests may be on their way: a number in all, and a number to each server, so that a silent server, to
+// which each request lasts a minute, leaves room for requests to others. A request that may not go yet waits in its
+// server's line. The server with the fewest requests on their way comes first. Belongs to the network thread.
 #pragma once
 
 #include <cstddef>
@@ -18,18 +18,19 @@ class RequestLines {
  public:
   RequestLines(size_t most, size_t mostToOneServer) : most_(most), mostToOneServer_(mostToOneServer) {}
 
-  // Counts it and answers true, or puts it in line. One that cannot wait is always counted.
+  // Counts the request and returns true, or puts it in line and returns false. A request that has a deadline of its own
+  // cannot wait and is always counted.
   [[nodiscard]] bool mayGo(URLTransfer& transfer);
-  // One that was counted goes no more.
+  // A counted request has ended.
   void hasGone(const URLTransfer& transfer);
-  // The next that may go, taken out of its line and not counted, or null.
+  // Takes the next request that may go out of its line, without counting it; null when there is none.
   [[nodiscard]] std::shared_ptr<URLTransfer> next();
 
  private:
   struct Server {
     size_t active = 0;
-    std::deque<std::shared_ptr<URLTransfer>>
-        line;  // those among them that are in line no more are passed over
+    // Some have ended meanwhile; next() passes over these.
+    std::deque<std::shared_ptr<URLTransfer>> line;
   };
   using Servers = std::map<std::string, Server, std::less<>>;
   void forgetIfUnused(Servers::iterator server);
@@ -37,7 +38,7 @@ class RequestLines {
   const size_t most_, mostToOneServer_;
   size_t active_ = 0;
   size_t inLine_ = 0;
-  Servers servers_;  // that have any
+  Servers servers_;  // with requests on their way or in line
 };
 
 }  // namespace kyt

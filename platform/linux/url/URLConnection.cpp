@@ -18,8 +18,8 @@
 namespace kyt {
 namespace {
 
-constexpr uint8_t kClosed = 7,
-                  kCloseWait = 8;  // the kernel's states of a connection: TCP_CLOSE, TCP_CLOSE_WAIT
+// The kernel's states of a connection: TCP_CLOSE, TCP_CLOSE_WAIT.
+constexpr uint8_t kClosed = 7, kCloseWait = 8;
 
 const sockaddr& generic(const sockaddr_storage& address) {
   return reinterpret_cast<const sockaddr&>(address);

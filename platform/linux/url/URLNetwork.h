@@ -33,7 +33,7 @@ namespace kyt {
 class IdlePools {
  public:
   explicit IdlePools(size_t most) : most_(most) {}
-  // One that is too much now and is no longer among them, or null.
+  // The pool that had to leave to keep the limit, or null.
   [[nodiscard]] URLConnectionPool* add(URLConnectionPool& pool) {
     pools_.append(pool);
     pool.isKept = true;
@@ -116,7 +116,7 @@ class URLNetwork {
   void activate(URLTransfer& transfer);  // or puts it in line
   void activateNextInLine();
   void armDeadline(URLTransfer& transfer);
-  void withdraw(URLTransfer& transfer);  // from its pool, or from those that wait
+  void withdraw(URLTransfer& transfer);  // from its pool, or from the waiting ones
   void finish(URLTransfer& transfer);    // its result is set
   void fail(URLTransfer& transfer, int32_t code, std::string description);
   void unlistIfUnused(URLSessionState& session);

@@ -65,8 +65,8 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   bool replyTooLong = false;        // … or ended
   bool hasBegun = false;            // it was handed to a connection, which may have sent some of it
   bool wasToBeRepeated = false;     // libcurl was about to send it again, and was not let
-  bool foundEndedConnection =
-      false;  // the kept connection chosen for it was none any more, so it has not begun
+  // The kept connection that was chosen for it had ended already, so the request has not begun.
+  bool foundEndedConnection = false;
   // libcurl has ended it, and what becomes of it is not decided: the server may not have it, and others need the answers
   // that its connection still brings.
   std::optional<CURLcode> endedWith;

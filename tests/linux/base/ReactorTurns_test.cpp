@@ -36,8 +36,8 @@ bool onReactorThread() {
 class Source {
  public:
   Source(EpollReactor& reactor, Executor& executor, std::function<void()> work) {
-    auto shared =
-        std::make_shared<std::function<void()>>(std::move(work));  // what waits in the queue outlives us
+    // What waits in the queue outlives us.
+    auto shared = std::make_shared<std::function<void()>>(std::move(work));
     watch_ = reactor.watch(event_.get(), ready::readable | ready::edgeTriggered,
                            [queue = SerialQueue::create("source", executor), shared](unsigned) {
                              queue->async([shared] { (*shared)(); });

@@ -121,8 +121,8 @@ TEST_F(SerialQueueTest, KnowsWhetherTheCallerRunsIt) {
 
 TEST_F(SerialQueueTest, IsOneBlockOfAtMost96Bytes) {
   auto queue = makeQueue();
-  const void* block =
-      reinterpret_cast<const std::byte*>(queue.get()) - 2 * sizeof(void*);  // after the counts
+  // After the counts.
+  const void* block = reinterpret_cast<const std::byte*>(queue.get()) - 2 * sizeof(void*);
 #if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__) && !defined(__has_feature)
   EXPECT_LE(malloc_usable_size(const_cast<void*>(block)), 96u + sizeof(void*));
 #endif
