@@ -234,14 +234,16 @@ class TestHTTP2Server::Implementation {
         prefaced_ = true;
         in_.erase(0, kPreface.size());
       }
-      while (prefaced_ && in_.size() >= kFrameHead) {
-        const size_t size = readNumber(std::string_view(in_).substr(0, 3));
-        if (in_.size() < kFrameHead + size) return;
-        const std::string whole = in_.substr(0, kFrameHead + size);
-        in_.erase(0, whole.size());
-        take(static_cast<uint8_t>(whole[3]), static_cast<uint8_t>(whole[4]),
-             readNumber(std::string_view(whole).substr(5, 4)), std::string_view(whole).substr(kFrameHead));
+      size_t taken = 0;
+      while (prefaced_ && in_.size() - taken >= kFrameHead) {
+        const std::string_view rest = std::string_view(in_).substr(taken);
+        const size_t whole = kFrameHead + readNumber(rest.substr(0, 3));
+        if (rest.size() < whole) break;
+        taken += whole;
+        take(static_cast<uint8_t>(rest[3]), static_cast<uint8_t>(rest[4]), readNumber(rest.substr(5, 4)),
+             rest.substr(kFrameHead, whole - kFrameHead));
       }
+      in_.erase(0, taken);
     }
 
     void take(uint8_t type, uint8_t flags, uint32_t stream, std::string_view payload) {
