@@ -46,31 +46,17 @@ if(KYT_COVERAGE)
   target_link_options(kyt_options INTERFACE --coverage)
 endif()
 
-# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library. Its objects can be linked with and without
-# optimisation at link time.
+# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library.
 function(kyt_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;LINKS;PRIVATE_LINKS" ${ARGN})
   add_library(${name} STATIC ${ARG_SOURCES})
   target_link_libraries(${name} PUBLIC kyt_options ${ARG_LINKS} PRIVATE ${ARG_PRIVATE_LINKS})
-  if(CMAKE_INTERPROCEDURAL_OPTIMIZATION AND CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
-    target_compile_options(${name} PRIVATE -ffat-lto-objects)
-  endif()
-endfunction()
-
-# kyt_plain_link(NAME): the program is linked without optimisation at link time, which makes machine code of all
-# libraries once more: too much for programs of which nobody measures the speed.
-function(kyt_plain_link name)
-  set_target_properties(${name} PROPERTIES INTERPROCEDURAL_OPTIMIZATION OFF)
-  if(CMAKE_INTERPROCEDURAL_OPTIMIZATION AND CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
-    target_link_options(${name} PRIVATE -fno-lto)
-  endif()
 endfunction()
 
 # What tests are compiled with: without optimisation, for nothing measures them, and with the headers of the test
 # framework and of the standard library compiled once. No header of this project is among those.
 function(kyt_test_options name)
   target_compile_options(${name} PRIVATE -O0 -U_FORTIFY_SOURCE)
-  kyt_plain_link(${name})
   if(NOT KYT_PRECOMPILED_HEADERS)
     return()
   endif()
@@ -82,7 +68,6 @@ function(kyt_test_options name)
     if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")  # the compiler cache finds again what holds no time
       target_compile_options(kyt_tests_headers PRIVATE "SHELL:-Xclang -fno-pch-timestamp")
     endif()
-    kyt_plain_link(kyt_tests_headers)
     target_precompile_headers(kyt_tests_headers PRIVATE <gtest/gtest.h> <algorithm> <array> <atomic> <chrono>
       <condition_variable> <filesystem> <fstream> <functional> <future> <map> <memory> <mutex> <optional> <set> <sstream>
       <string> <string_view> <thread> <unordered_map> <utility> <variant> <vector>)
