@@ -62,11 +62,32 @@ struct TestPlatform {
   FakePluginBundles pluginBundles;
   FakePowerLog powerLog;
 
-  Platform platform{limits,         counters,      log,           clock,        timers,
-                    reactor,        executor,      random,        userDefaults, deviceProperties,
-                    consent,        cryptography,  propertyLists, json,         deflate,
-                    memory,         urlSessions,   udpSockets,    clientBundle, daemonBundle,
-                    fileExtensions, pluginBundles, powerLog,      budget};
+  Platform platform{
+      .limits = limits,
+      .counters = counters,
+      .log = log,
+      .clock = clock,
+      .timers = timers,
+      .reactor = reactor,
+      .executor = executor,
+      .random = random,
+      .userDefaults = userDefaults,
+      .deviceProperties = deviceProperties,
+      .consent = consent,
+      .cryptography = cryptography,
+      .propertyLists = propertyLists,
+      .json = json,
+      .deflate = deflate,
+      .memory = memory,
+      .urlSessions = urlSessions,
+      .udpSockets = udpSockets,
+      .clientBundle = clientBundle,
+      .daemonBundle = daemonBundle,
+      .fileExtensions = fileExtensions,
+      .pluginBundles = pluginBundles,
+      .powerLog = powerLog,
+      .budget = budget,
+  };
 
   DeviceIdentity deviceIdentity{platform};
   Environment environment{platform, deviceIdentity,

@@ -65,9 +65,31 @@ struct Machine {
   DlopenPluginBundles pluginBundles{"/nonexistent", log};
   JournalPowerLog powerLog{counters};
   Platform platform{
-      limits,       counters,         log,     clock,        *reactor,       *reactor,      workers,  random,
-      userDefaults, deviceProperties, consent, cryptography, propertyLists,  json,          deflate,  memory,
-      urlSessions,  udpSockets,       bundle,  bundle,       fileExtensions, pluginBundles, powerLog, budget};
+      .limits = limits,
+      .counters = counters,
+      .log = log,
+      .clock = clock,
+      .timers = *reactor,
+      .reactor = *reactor,
+      .executor = workers,
+      .random = random,
+      .userDefaults = userDefaults,
+      .deviceProperties = deviceProperties,
+      .consent = consent,
+      .cryptography = cryptography,
+      .propertyLists = propertyLists,
+      .json = json,
+      .deflate = deflate,
+      .memory = memory,
+      .urlSessions = urlSessions,
+      .udpSockets = udpSockets,
+      .clientBundle = bundle,
+      .daemonBundle = bundle,
+      .fileExtensions = fileExtensions,
+      .pluginBundles = pluginBundles,
+      .powerLog = powerLog,
+      .budget = budget,
+  };
   ~Machine() { end(); }
   // Nothing runs any more; what was counted stays.
   void end() {
