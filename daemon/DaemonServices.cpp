@@ -31,6 +31,7 @@ CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
   CurlURLSessionOptions options;
   options.certificateFile = settings.caFile;
   options.cellularInterfaces = settings.cellularInterfaces;
+  options.whenQuiet = giveFreeMemoryBack;  // replies may end long after the last worker did
   return options;
 }
 

@@ -71,6 +71,9 @@ class FailingDaemon : public DaemonProcess {
   // What hangs is done now.
   void goOn() { __atomic_store_n(&control_->error, 0, __ATOMIC_RELEASE); }
   void stopFailing() { __atomic_store_n(&control_->armed, 0, __ATOMIC_RELEASE); }
+  // None fails; calls() counts them.
+  void count(kyt_failing_call call) { fail(call, 0, kAlways); }
+  [[nodiscard]] int calls() const { return __atomic_load_n(&control_->seen, __ATOMIC_RELAXED); }
   [[nodiscard]] int failures() const { return __atomic_load_n(&control_->failed, __ATOMIC_RELAXED); }
 
  private:

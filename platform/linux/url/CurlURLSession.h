@@ -53,6 +53,10 @@ struct CurlURLSessionOptions {
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events
   std::string sysClassNet = "/sys/class/net";
   std::string resolverFile = "/etc/resolv.conf";
+  // Called when there was nothing to do for so long: by the last thread of completions when it ends, and by the network
+  // thread when no connection is left. No lock held.
+  Duration quietTime = std::chrono::seconds(10);
+  void (*whenQuiet)() = nullptr;
 };
 
 class CurlURLSessionFactory final : public URLSessionFactory {

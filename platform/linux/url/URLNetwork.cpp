@@ -32,8 +32,10 @@ bool namesItsScheme(const std::string& url) {
   return strncasecmp(url.c_str(), "http://", 7) == 0 || strncasecmp(url.c_str(), "https://", 8) == 0;
 }
 
-WorkerPoolOptions completionWorkers() {
+WorkerPoolOptions completionWorkers(const CurlURLSessionOptions& session) {
   WorkerPoolOptions options;
+  options.idleExit = session.quietTime;
+  options.whenQuiet = session.whenQuiet;
   options.runnable = 2;
   options.maxWorkers = 4;
   options.name = "kyt-url";
@@ -62,7 +64,14 @@ URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counte
       slowRetry_(
           deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->waitingTimer(); }, this),
       rest_(
-          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->sockets_.wake(); }, this) {}
+          deadlines_, [](void* network) { static_cast<URLNetwork*>(network)->sockets_.wake(); }, this),
+      quiet_(
+          deadlines_,
+          [](void* owner) {
+            const auto* network = static_cast<URLNetwork*>(owner);
+            if (network->sessions_.empty()) network->options_.whenQuiet();
+          },
+          this) {}
 
 URLNetwork::~URLNetwork() {
   if (epoll_ >= 0) close(epoll_);
@@ -199,7 +208,7 @@ URLFigures URLNetwork::figures() const {
 
 void URLNetwork::run() {
   beginServiceThread("kyt-network");
-  workers_ = std::make_unique<WorkerPool>(completionWorkers());
+  workers_ = std::make_unique<WorkerPool>(completionWorkers(options_));
   sockets_.setEpoll(epoll_);
   now_ = currentTime();
   for (;;) {
@@ -428,6 +437,7 @@ void URLNetwork::unlistIfUnused(URLSessionState& session) {
   if (!session.self || !session.transfers.empty() || session.pools[0] || session.pools[1]) return;
   sessions_.remove(session);
   const std::shared_ptr<URLSessionState> last = std::move(session.self);
+  if (sessions_.empty() && options_.whenQuiet != nullptr) quiet_.set(now_ + options_.quietTime);
 }
 
 }  // namespace kyt

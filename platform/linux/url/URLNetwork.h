@@ -189,7 +189,8 @@ class URLNetwork {
   std::vector<std::unique_ptr<URLConnectionPool>> retired_;
   Deadline settle_;  // route events come in bursts: what waits is tried a moment after the first
   Deadline slowRetry_;
-  Deadline rest_;  // of sockets that can be written to in vain
+  Deadline rest_;   // of sockets that can be written to in vain
+  Deadline quiet_;  // since no session had requests or connections any more
 
   std::unique_ptr<WorkerPool> workers_;  // made by the network thread, shut down by stop()
 };

@@ -741,5 +741,22 @@ TEST_F(CurlURLSession, CarriesManyIdleSessions) {
   EXPECT_TRUE(server_.waitForConnectionsOpen(0));
 }
 
+// Memory goes back then: replies may end long after the daemon's other work.
+TEST_F(CurlURLSession, SaysThatItIsQuietAfterItsCompletionsAndAfterItsConnections) {
+  static std::atomic<int> timesQuiet{0};
+  timesQuiet = 0;
+  options_.quietTime = std::chrono::milliseconds(20);
+  options_.whenQuiet = [] { ++timesQuiet; };
+  auto urls = session();
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_TRUE(eventually([&] { return timesQuiet == 1; })) << "its connection is kept";
+  EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
+  EXPECT_TRUE(eventually([&] { return timesQuiet == 2; }));
+  urls.reset();
+  EXPECT_TRUE(eventually([&] { return timesQuiet == 3; }));
+  factory_.reset();
+  EXPECT_EQ(timesQuiet, 3);
+}
+
 }  // namespace
 }  // namespace kyt

@@ -10,6 +10,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <linux/seccomp.h>
+#include <malloc.h>
 #include <poll.h>
 #include <pthread.h>
 #include <stdarg.h>
@@ -134,6 +135,7 @@ WRAPPED(void*, MAP_FAILED, mmap, (void* where, size_t size, int protection, int 
         (where, size, protection, flags, fd, offset))
 WRAPPED(int, -1, statfs, (const char* path, struct statfs* status), (path, status))
 WRAPPED(pid_t, -1, waitpid, (pid_t process, int* status, int options), (process, status, options))
+WRAPPED(int, 0, malloc_trim, (size_t kept), (kept))
 
 /* The kernel never refuses to forget what it watches: for that it needs neither memory nor room. */
 int epoll_ctl(int epoll, int what, int fd, struct epoll_event* event) {

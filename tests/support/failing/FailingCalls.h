@@ -10,7 +10,7 @@
   X(eventfd) X(timerfd_create) X(timerfd_settime) X(signalfd) X(stat) X(lstat) X(fstat) X(rename) X(fsync) \
   X(mkdir) X(opendir) X(readdir) X(unlink) X(fchmod) X(chmod) X(flock) X(ftruncate) X(fork) \
   X(pthread_create) X(poll) X(getrandom) X(setsockopt) X(getsockopt) X(setrlimit) X(getrlimit) X(prctl) \
-  X(mmap) X(statfs) X(waitpid)
+  X(mmap) X(statfs) X(waitpid) X(malloc_trim)
 #define KYT_FAILING_NUMBERS(X) \
   X(landlock_create_ruleset) X(landlock_add_rule) X(landlock_restrict_self) X(seccomp) X(capget) X(capset) \
   X(pidfd_open)
