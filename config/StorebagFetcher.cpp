@@ -15,7 +15,6 @@
 #include "platform/objects/Description.h"
 #include "platform/objects/Keys.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 
@@ -94,9 +93,8 @@ std::optional<Dictionary> signedContents(const Data& bag, PropertyLists& propert
 StorebagFetcher::StorebagFetcher(Configuration configuration, Mutex& backendClassLock)
     : configuration_(configuration), backendClassLock_(backendClassLock) {}
 
-std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::optional<String>& name,
-                                                                 int32_t& maxAge, bool& notModified,
-                                                                 std::optional<String>* lastModified) {
+URLRequest StorebagFetcher::storebagRequest(const std::optional<String>& name,
+                                            const std::optional<String>& lastModified) const {
   Log& log = configuration_.platform.log;
   const String version = configuration_.platform.clientBundle.version().value_or("8.0");
   URLRequest request;
@@ -104,45 +102,54 @@ std::optional<Dictionary> StorebagFetcher::fetchStorebagWithName(const std::opti
                                                    name ? Value(*name) : Value(), version});
   request.timeout = kRequestTimeout;
   request.maxRedirects = kMaxRedirects;
-  request.isAwaited = true;
-  const std::string address = request.url;
-  log.debug("fetchStorebagWithName: Storebag Server URL: %s", address.c_str());
-  const bool conditional = lastModified != nullptr && lastModified->has_value();
-  if (conditional) {
-    log.debug("fetchStorebagWithName: Adding 'Last-Modified: %s' to the header", (*lastModified)->c_str());
-    request.headers.emplace_back("If-Modified-Since", (*lastModified)->str());
+  log.debug("fetchStorebagWithName: Storebag Server URL: %s", request.url.c_str());
+  if (lastModified) {
+    log.debug("fetchStorebagWithName: Adding 'Last-Modified: %s' to the header", lastModified->c_str());
+    request.headers.emplace_back("If-Modified-Since", lastModified->str());
   }
+  return request;
+}
 
-  const Reply reply = sendSynchronousRequest(std::move(request));
+StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
+    const std::optional<String>& name, const std::optional<String>& lastModified) {
+  Log& log = configuration_.platform.log;
+  Fetch<Dictionary> fetch;
+  fetch.lastModified = lastModified;
+  URLRequest request = storebagRequest(name, lastModified);
+  const std::string address = request.url;
+  const URLReply reply = startAndWait(std::move(request), [this](URLRequest sent, URLCompletion completion) {
+    urlSession().start(std::move(sent), std::move(completion));
+  });
   if (reply.error || !reply.response) {
     log.normal(
         "fetchStorebagWithName: Error resolving with lookup server %s, sendSynchronousRequest error %s",
         address.c_str(), reply.error ? reply.error->localizedDescription.c_str() : "(null)");
-    if (!name || *name != kFallbackStorebagName) return std::nullopt;
+    if (!name || *name != kFallbackStorebagName) return fetch;
     log.normal("fetchStorebagWithName: Loading default storebag '%s'", name->c_str());
     log.normal(
         "fetchStorebagWithName: For %d seconds it replaces the last good one: client types 7, 11, 13 and 20 post nothing",
         kFallbackRefreshCycle);
-    return fallbackStorebag();
+    fetch.result = fallbackStorebag();
+    return fetch;
   }
 
-  maxAge = maxAgeFromCacheControl(reply.response->header("Cache-Control"));
-  const std::optional<std::string> modified = reply.response->header("Last-Modified");
-  if (lastModified != nullptr && modified) {
-    if (conditional && (!reply.data || reply.data->empty())) {
+  fetch.maxAge = maxAgeFromCacheControl(reply.response->header("Cache-Control"));
+  if (const std::optional<std::string> modified = reply.response->header("Last-Modified")) {
+    if (lastModified && (!reply.data || reply.data->empty())) {
       log.debug("fetchStorebagWithName: storebag content has not changed. using its cached version");
-      notModified = true;
-      return std::nullopt;
+      fetch.result = NotModified();
+      return fetch;
     }
-    *lastModified = String(*modified);
-    log.debug("fetchStorebagWithName: New 'Last-Modified: %s' received", (*lastModified)->c_str());
+    fetch.lastModified = String(*modified);
+    log.debug("fetchStorebagWithName: New 'Last-Modified: %s' received", fetch.lastModified->c_str());
   }
-  std::optional<Dictionary> bag = verifiedBag(reply);
   // The status decides nothing, but an error page is no storebag, and then it is the reason that helps.
   const int status = reply.response->status;
-  if (!bag && (status < 200 || status > 299))
+  if (std::optional<Dictionary> bag = verifiedBag(reply))
+    fetch.result = std::move(*bag);
+  else if (status < 200 || status > 299)
     log.normal("fetchStorebagWithName: %s answered with status %d", address.c_str(), status);
-  return bag;
+  return fetch;
 }
 
 std::vector<std::unique_ptr<PublicKey>> StorebagFetcher::publicKeys() const {
@@ -176,7 +183,7 @@ bool StorebagFetcher::verifies(const Data& bag, const Data& signature) const {
   return false;
 }
 
-std::optional<Dictionary> StorebagFetcher::verifiedBag(const Reply& reply) {
+std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply) {
   Log& log = configuration_.platform.log;
   PropertyLists& propertyLists = configuration_.platform.propertyLists;
   std::variant<Value, Error> document =
@@ -196,69 +203,63 @@ std::optional<Dictionary> StorebagFetcher::verifiedBag(const Reply& reply) {
   return signedContents(*bag, propertyLists, log);
 }
 
-std::optional<Dictionary> StorebagFetcher::fetchStorebagForEnvironmentAndClientType(
-    int32_t clientType, int32_t& maxAge, std::optional<String>& version, bool& notModified,
-    std::optional<String>* lastModified) {
+StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagForEnvironmentAndClientType(
+    int32_t clientType, const std::optional<String>& lastModified) {
   Log& log = configuration_.platform.log;
-  const std::optional<String> name = storebagNameForClientType(clientType);
+  Fetch<Section> fetch;
+  fetch.lastModified = lastModified;
   if (clientType == 0) {
     log.error("fetchStorebagForEnvironmentAndClientType: Could not find storebag name for client type %d",
               clientType);
-    return std::nullopt;
+    return fetch;
   }
-  const std::optional<Dictionary> bag = fetchStorebagWithName(name, maxAge, notModified, lastModified);
-  if (!bag) {
-    if (!notModified) {
-      log.error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type %d",
-                clientType);
-    }
-    return std::nullopt;
+  Fetch<Dictionary> whole = fetchStorebagWithName(storebagNameForClientType(clientType), lastModified);
+  fetch.maxAge = whole.maxAge;
+  fetch.lastModified = std::move(whole.lastModified);
+  if (std::holds_alternative<NotModified>(whole.result)) {
+    fetch.result = NotModified();
+    return fetch;
   }
+  const Dictionary* bag = std::get_if<Dictionary>(&whole.result);
+  if (bag == nullptr) {
+    log.error("fetchStorebagForEnvironmentAndClientType: Could not fetch storebag for client type %d",
+              clientType);
+    return fetch;
+  }
+  const Dictionary* section = sectionInForce(*bag, clientType);
+  if (section == nullptr) return fetch;
 
+  // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
+  const String* version = stringEntry(*bag, "version");
+  if (version == nullptr) {
+    log.normal(
+        "fetchStorebagForEnvironmentAndClientType: The storebag for client type %d has no text \"version\"",
+        clientType);
+    return fetch;
+  }
+  if (const Value* refreshCycle = bag->find("refresh_cycle")) {
+    fetch.maxAge = std::min(refreshCycle->intValue(), kMaxStorebagAge);
+    log.normal("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=%d", fetch.maxAge);
+  }
+  fetch.result = Section{*section, *version};
+  return fetch;
+}
+
+const Dictionary* StorebagFetcher::sectionInForce(const Dictionary& bag, int32_t clientType) const {
+  Log& log = configuration_.platform.log;
   const uint32_t environment = configuration_.environment.userDefaultsEnvironment();
-  const std::optional<String> sectionName = environmentName(environment);
-  const Dictionary* section = sectionEntry(*bag, sectionName);
+  const std::optional<String> name = environmentName(environment);
+  const Dictionary* section = sectionEntry(bag, name);
   if (section == nullptr && environment == kEnvironmentSeed) {
     log.error("fetchStorebagForEnvironmentAndClientType: Seed section is missing in the storebag.");
-    section = sectionEntry(*bag, environmentName(kEnvironmentRelease));
+    section = sectionEntry(bag, environmentName(kEnvironmentRelease));
   }
   if (section == nullptr) {
     log.error(
         "fetchStorebagForEnvironmentAndClientType: Could not find storebag for client type %d with %s environment",
-        clientType, sectionName ? sectionName->c_str() : "(null)");
-    return std::nullopt;
+        clientType, name ? name->c_str() : "(null)");
   }
-
-  // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
-  const String* bagVersion = stringEntry(*bag, "version");
-  if (bagVersion == nullptr) {
-    log.normal(
-        "fetchStorebagForEnvironmentAndClientType: The storebag for client type %d has no text \"version\"",
-        clientType);
-    return std::nullopt;
-  }
-  version = *bagVersion;
-  if (const Value* refreshCycle = bag->find("refresh_cycle")) {
-    maxAge = std::min(refreshCycle->intValue(), kMaxStorebagAge);
-    log.normal("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=%d", maxAge);
-  }
-  return *section;
-}
-
-StorebagFetcher::Reply StorebagFetcher::sendSynchronousRequest(URLRequest request) {
-  // Shared, because the completion may still be leaving signal() when wait() has returned.
-  struct Wait {
-    Semaphore done;
-    Reply reply;
-  };
-  auto wait = std::make_shared<Wait>();
-  urlSession().start(std::move(request), [wait](std::optional<Data> data, std::optional<URLResponse> response,
-                                                std::optional<Error> error) {
-    wait->reply = Reply{std::move(data), std::move(response), std::move(error)};
-    wait->done.signal();
-  });
-  wait->done.wait();
-  return std::move(wait->reply);
+  return section;
 }
 
 URLSession& StorebagFetcher::urlSession() {

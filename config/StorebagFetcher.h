@@ -4,10 +4,9 @@
 // same bag download it once.
 //
 // A fetch blocks its thread until the reply is there, at most 15 seconds, or until the shut-down cancels what
-// threads wait for; then none can begin any more. The requests of the whole process
-// go through one URL session, made at first use while holding the lock of the class KYTReportingBackend,
-// which the composition root owns. Every failure is an absent result and log lines that tell its cause at the default
-// level; nothing here is fatal.
+// threads wait for; then none can begin any more. The requests of the whole process go through one URL session,
+// made at first use while holding the lock of the class KYTReportingBackend, which the composition root owns.
+// Every failure is a `Failed` and log lines that tell its cause at the default level; nothing here is fatal.
 //
 // The keys are read at each download: "publicKey.der" of the client framework's bundle and, where it is there,
 // "publicKey2.der" beside it. A bag that either verifies counts, so that keys are replaced by having both for a while.
@@ -16,6 +15,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <variant>
 #include <vector>
 
 #include "config/Configuration.h"
@@ -31,32 +31,42 @@ inline constexpr int32_t kMaxStorebagAge = 86400;  // seconds
 
 class StorebagFetcher {
  public:
+  // The server said that the bag behind the date it was asked with still holds.
+  struct NotModified {};
+  // No reply, or no good bag in it.
+  struct Failed {};
+  // The part of a bag for the environment in force, and the version of the whole bag.
+  struct Section {
+    Dictionary contents;
+    String version;
+  };
+  // How a fetch ended. A reply counts for the other two even if its bag was not good.
+  template <typename Fetched>
+  struct Fetch {
+    std::variant<Fetched, NotModified, Failed> result = Failed();
+    int32_t maxAge = 0;                  // seconds; 0 when no reply came
+    std::optional<String> lastModified;  // to ask with next time: the reply's, else the one asked with
+  };
+
   StorebagFetcher(Configuration configuration, Mutex& backendClassLock);
   StorebagFetcher(const StorebagFetcher&) = delete;
   StorebagFetcher& operator=(const StorebagFetcher&) = delete;
 
-  // One download and verification. The whole bag, or none. `maxAge` (seconds) is written as soon as a reply
-  // came; `notModified` is set when the server said that the bag behind `lastModified` still holds.
-  // `lastModified` (not null) is sent when it has a value and replaced by what the reply says.
-  [[nodiscard]] std::optional<Dictionary> fetchStorebagWithName(const std::optional<String>& name,
-                                                                int32_t& maxAge, bool& notModified,
-                                                                std::optional<String>* lastModified);
+  // One download and verification: the whole bag. With `lastModified`, the server is asked to send the bag only
+  // if it has changed since.
+  [[nodiscard]] Fetch<Dictionary> fetchStorebagWithName(const std::optional<String>& name,
+                                                        const std::optional<String>& lastModified);
 
-  // The section for the environment in force, and the bag's version.
-  [[nodiscard]] std::optional<Dictionary> fetchStorebagForEnvironmentAndClientType(
-      int32_t clientType, int32_t& maxAge, std::optional<String>& version, bool& notModified,
-      std::optional<String>* lastModified);
+  // The same, and the choice of the section. `maxAge` is the bag's own where it has one, at most a day.
+  [[nodiscard]] Fetch<Section> fetchStorebagForEnvironmentAndClientType(
+      int32_t clientType, const std::optional<String>& lastModified);
 
  private:
-  struct Reply {
-    std::optional<Data> data;
-    std::optional<URLResponse> response;
-    std::optional<Error> error;
-  };
-
-  Reply sendSynchronousRequest(URLRequest request);
+  [[nodiscard]] URLRequest storebagRequest(const std::optional<String>& name,
+                                           const std::optional<String>& lastModified) const;
   URLSession& urlSession();
-  std::optional<Dictionary> verifiedBag(const Reply& reply);
+  std::optional<Dictionary> verifiedBag(const URLReply& reply);
+  [[nodiscard]] const Dictionary* sectionInForce(const Dictionary& bag, int32_t clientType) const;
   [[nodiscard]] std::vector<std::unique_ptr<PublicKey>> publicKeys() const;
   [[nodiscard]] bool verifies(const Data& bag, const Data& signature) const;
 

@@ -99,10 +99,10 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   void refreshCensus() REQUIRES(monitor_);
   uint64_t addSessionHealthInfo(const ReportingdSession& session, HealthReport& healthReport)
       REQUIRES(monitor_);
-  void fetchAndCacheStorebag(int32_t clientType) REQUIRES(monitor_);
+  // Puts a new entry in the place of `existing`, that name's until now or null; returns the new one's section.
+  std::optional<Dictionary> fetchAndCacheStorebag(int32_t clientType, const std::optional<String>& name,
+                                                  const Dictionary* existing) REQUIRES(monitor_);
   [[nodiscard]] const Dictionary* cachedEntry(const std::optional<String>& name) const REQUIRES(monitor_);
-  [[nodiscard]] std::optional<Dictionary> cachedData(const std::optional<String>& name) const
-      REQUIRES(monitor_);
 
   // Constant after construction.
   const Configuration configuration_;

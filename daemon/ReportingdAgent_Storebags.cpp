@@ -2,6 +2,7 @@
 // section and is not tried again for a while, so that a server in trouble is not stormed.
 #include <cmath>
 #include <utility>
+#include <variant>
 
 #include "config/ClientTypes.h"
 #include "config/StorebagFetcher.h"
@@ -36,6 +37,30 @@ std::optional<String> stringEntry(const Dictionary& entry, const char* key) {
   return *value->string();
 }
 
+std::optional<Dictionary> sectionOf(const Dictionary& entry) {
+  const Value* data = entry.find(kData);
+  if (data == nullptr || !data->isDictionary()) return std::nullopt;
+  return *data->dictionary();
+}
+
+// Whether the entry is used as it is, with the reason in the log: it is fresh, or it failed a short while ago.
+bool entryHolds(const Dictionary& entry, int32_t clientType, Platform& platform) {
+  const double fetchTime = entry.find(kFetchTime)->date().value_or(Date()).secondsSince1970;
+  const double age = std::fabs(platform.clock.timeOfDay().asSeconds() - fetchTime);
+  const bool fresh = stringEntry(entry, kFetchState) == String(kSuccessful);
+  if (fresh && age < entry.find(kMaxAge)->intValue()) {
+    platform.log.debug("storebagForSession: Cached storebag found for client type %d", clientType);
+    return true;
+  }
+  if (!fresh && age < kStorebagRetrySeconds) {
+    platform.log.normal(
+        "storebagForSession: Not fetching storebag for client type %d - must wait %d seconds between attempts",
+        clientType, kStorebagRetrySeconds);
+    return true;
+  }
+  return false;
+}
+
 }  // namespace
 
 const Dictionary* ReportingdAgent::cachedEntry(const std::optional<String>& name) const {
@@ -43,37 +68,16 @@ const Dictionary* ReportingdAgent::cachedEntry(const std::optional<String>& name
   return entry != nullptr ? entry->dictionary() : nullptr;
 }
 
-std::optional<Dictionary> ReportingdAgent::cachedData(const std::optional<String>& name) const {
-  const Dictionary* entry = cachedEntry(name);
-  const Value* data = entry != nullptr ? entry->find(kData) : nullptr;
-  if (data == nullptr || !data->isDictionary()) return std::nullopt;
-  return *data->dictionary();
-}
-
 std::optional<Dictionary> ReportingdAgent::storebagForSession(ReportingdSession& session) {
-  Log& log = configuration_.platform.log;
+  Platform& platform = configuration_.platform;
   const int32_t clientType = clientTypeOf(session);
   const std::optional<String> name = storebagNameForClientType(clientType);
-  log.debug("storebagForSession: Retrieving storebag for session %u with client type %d", session.sessionID(),
-            clientType);
+  platform.log.debug("storebagForSession: Retrieving storebag for session %u with client type %d",
+                     session.sessionID(), clientType);
   MonitorLock lock(monitor_);
-  if (const Dictionary* entry = cachedEntry(name)) {
-    const double fetchTime = entry->find(kFetchTime)->date().value_or(Date()).secondsSince1970;
-    const double age = std::fabs(configuration_.platform.clock.timeOfDay().asSeconds() - fetchTime);
-    const bool fresh = stringEntry(*entry, kFetchState) == String(kSuccessful);
-    if (fresh && age < entry->find(kMaxAge)->intValue()) {
-      log.debug("storebagForSession: Cached storebag found for client type %d", clientType);
-      return cachedData(name);
-    }
-    if (!fresh && age < kStorebagRetrySeconds) {
-      log.normal(
-          "storebagForSession: Not fetching storebag for client type %d - must wait %d seconds between attempts",
-          clientType, kStorebagRetrySeconds);
-      return cachedData(name);
-    }
-  }
-  fetchAndCacheStorebag(clientType);
-  return cachedData(name);
+  const Dictionary* entry = cachedEntry(name);
+  if (entry != nullptr && entryHolds(*entry, clientType, platform)) return sectionOf(*entry);
+  return fetchAndCacheStorebag(clientType, name, entry);
 }
 
 std::optional<String> ReportingdAgent::storebagVersionForSession(ReportingdSession& session) {
@@ -82,36 +86,34 @@ std::optional<String> ReportingdAgent::storebagVersionForSession(ReportingdSessi
   return entry != nullptr ? stringEntry(*entry, kVersion) : std::nullopt;
 }
 
-void ReportingdAgent::fetchAndCacheStorebag(int32_t clientType) {
+std::optional<Dictionary> ReportingdAgent::fetchAndCacheStorebag(int32_t clientType,
+                                                                 const std::optional<String>& name,
+                                                                 const Dictionary* existing) {
   Log& log = configuration_.platform.log;
   log.debug("fetchAndCacheStorebag: Fetching storebag for client type %d", clientType);
-  const std::optional<String> name = storebagNameForClientType(clientType);
   if (!name) {
     log.error("fetchAndCacheStorebag: clientType %d is invalid", clientType);
-    return;
+    return std::nullopt;
   }
   Dictionary entry;
-  if (const Dictionary* existing = cachedEntry(name)) entry = *existing;
-  int32_t maxAge = 0;  // what an unreachable server leaves
-  bool notModified = false;
-  std::optional<String> version;
-  std::optional<String> lastModified = stringEntry(entry, kLastModified);
-  std::optional<Dictionary> section = fetcher_.fetchStorebagForEnvironmentAndClientType(
-      clientType, maxAge, version, notModified, &lastModified);
-  log.debug("fetchAndCacheStorebag: Storebag max age: %d seconds", maxAge);
-  const bool successful = section || notModified;
-  if (section) {
-    entry.set(kData, std::move(*section));
-    if (version) entry.set(kVersion, *version);
-  } else if (!notModified) {
-    log.error("fetchAndCacheStorebag: Unable to fetch storebag for client type %d", clientType);
+  if (existing != nullptr) entry = *existing;
+  StorebagFetcher::Fetch<StorebagFetcher::Section> fetch =
+      fetcher_.fetchStorebagForEnvironmentAndClientType(clientType, stringEntry(entry, kLastModified));
+  log.debug("fetchAndCacheStorebag: Storebag max age: %d seconds", fetch.maxAge);
+  const bool failed = std::holds_alternative<StorebagFetcher::Failed>(fetch.result);
+  if (failed) log.error("fetchAndCacheStorebag: Unable to fetch storebag for client type %d", clientType);
+  if (auto* section = std::get_if<StorebagFetcher::Section>(&fetch.result)) {
+    entry.set(kData, std::move(section->contents));
+    entry.set(kVersion, std::move(section->version));
   }
   entry.set(kFetchTime, Date{configuration_.platform.clock.timeOfDay().asSeconds()});
-  entry.set(kFetchState, successful ? kSuccessful : kFailure);
-  entry.set(kMaxAge, maxAge);
-  if (lastModified) entry.set(kLastModified, *lastModified);
+  entry.set(kFetchState, failed ? kFailure : kSuccessful);
+  entry.set(kMaxAge, fetch.maxAge);
+  if (fetch.lastModified) entry.set(kLastModified, std::move(*fetch.lastModified));
+  std::optional<Dictionary> section = sectionOf(entry);
   _cachedStorebags.set(*name, std::move(entry));
   cachedStorebagsSize_.reset();
+  return section;
 }
 
 }  // namespace kyt

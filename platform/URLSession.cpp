@@ -2,9 +2,11 @@
 
 #include <algorithm>
 #include <cctype>
+#include <utility>
 
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
+#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 
@@ -18,6 +20,19 @@ std::optional<std::string> URLResponse::header(std::string_view name) const {
     all = all ? *all + ", " + value : value;
   }
   return all;
+}
+
+URLReply startAndWait(URLRequest request, Function<void(URLRequest, URLCompletion)> start) {
+  Semaphore done;
+  URLReply reply;
+  request.isAwaited = true;
+  start(std::move(request),
+        [&](std::optional<Data> data, std::optional<URLResponse> response, std::optional<Error> error) {
+          reply = URLReply{std::move(data), std::move(response), std::move(error)};
+          done.signal();
+        });
+  done.wait();
+  return reply;
 }
 
 size_t OutstandingBytes::of(const URLRequest& request) {

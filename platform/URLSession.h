@@ -57,6 +57,17 @@ struct URLResponse {
 // headers what had come by then. The status a server has decided on counts even if its reply breaks off.
 using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
 
+// What a completion was called with.
+struct URLReply {
+  std::optional<Data> data;
+  std::optional<URLResponse> response;
+  std::optional<Error> error;
+};
+
+// Marks the request as awaited, has `start` start it with the completion that it is given, and blocks until that
+// has run; as long as the request takes. Any thread, but none that completions need to run on.
+[[nodiscard]] URLReply startAndWait(URLRequest request, Function<void(URLRequest, URLCompletion)> start);
+
 struct URLSessionConfiguration {
   std::string sourceApplication;  // sent as X-KYT-Source-Application; empty: not sent
   // A request that cannot leave (no route, no resolver) waits for the network.

@@ -5,7 +5,6 @@
 #include "platform/base/TextEscape.h"
 #include "platform/objects/KeyedArchive.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 
@@ -24,7 +23,6 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.url = postURL_->str();
   request.headers = {{"Content-Type", "application/octet-stream"}};
   request.body = std::move(*body);
-  request.isAwaited = true;
   request.account = userAccount();
   const auto poster = connectivityDelegate();
   // Deliberately a success: the session is ending, and its client is not told that something is wrong.
@@ -33,18 +31,10 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
     return true;
   }
 
-  Semaphore answered;
-  std::optional<Data> reply;
-  std::optional<Error> error;
-  poster->postURLRequestWithCompletionHandler(
-      std::move(request),
-      [&](std::optional<Data> data, const std::optional<URLResponse>&, std::optional<Error> failure) {
-        reply = std::move(data);
-        error = std::move(failure);
-        answered.signal();
-      });
-  answered.wait();
-  return finishUpload(reply, error);
+  const URLReply reply = startAndWait(std::move(request), [&](URLRequest sent, URLCompletion completion) {
+    poster->postURLRequestWithCompletionHandler(std::move(sent), std::move(completion));
+  });
+  return finishUpload(reply.data, reply.error);
 }
 
 // The status is deliberately not looked at: any body is taken for the location.

@@ -17,7 +17,6 @@
 #include "platform/base/TextEscape.h"
 #include "platform/objects/Description.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 #include "platform/queues/WorkerPool.h"
 
 namespace kyt {
@@ -202,32 +201,23 @@ std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, D
   if (!isAddress(request.url)) return std::nullopt;
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
   request.body = std::move(body);
-  request.isAwaited = true;
   return request;
 }
 
 bool UploadBackend::post(ReportingSessionConnectivityInterface& poster, URLRequest request) {
-  Semaphore answered;
-  std::optional<Data> reply;
-  std::optional<Error> failure;
-  poster.postURLRequestWithCompletionHandler(
-      std::move(request),
-      [&](std::optional<Data> data, const std::optional<URLResponse>&, std::optional<Error> error) {
-        reply = std::move(data);
-        failure = std::move(error);
-        answered.signal();
-      });
-  answered.wait();
+  const URLReply reply = startAndWait(std::move(request), [&](URLRequest sent, URLCompletion completion) {
+    poster.postURLRequestWithCompletionHandler(std::move(sent), std::move(completion));
+  });
   Log& log = platform().log;
-  if (!reply) {
+  if (!reply.data) {
     platform().counters.add(Reason::postFailed);
     log.error("UploadBackend(uploadFileAtPath): post %s",
-              failure ? failure->localizedDescription.c_str() : "(null)");
+              reply.error ? reply.error->localizedDescription.c_str() : "(null)");
     return false;
   }
   // The status is deliberately not looked at: servers of this kind say in the text whether they have the file.
-  const bool readable = isValidUTF8(reply->view());
-  const std::string text(readable ? reply->view() : "(null)");
+  const bool readable = isValidUTF8(reply.data->view());
+  const std::string text(readable ? reply.data->view() : "(null)");
   log.normal("UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s", uploadURL_->c_str(),
              text.c_str());
   return readable && text.find("success") != std::string::npos;

@@ -4,6 +4,8 @@
 
 #include <string>
 #include <thread>
+#include <utility>
+#include <variant>
 
 #include "platform/UserDefaults.h"
 #include "platform/objects/Keys.h"
@@ -32,12 +34,24 @@ class StorebagFetcherTest : public ::testing::Test {
     test_.userDefaults.put(kKYTReportingDefaultsDomain, "environmentType", type);
   }
 
+  // Keeps what a fetch said for the next one, as the cache does.
+  template <typename Fetched>
+  std::optional<Fetched> taken(StorebagFetcher::Fetch<Fetched> fetch) {
+    maxAge_ = fetch.maxAge;
+    notModified_ = std::holds_alternative<StorebagFetcher::NotModified>(fetch.result);
+    lastModified_ = std::move(fetch.lastModified);
+    Fetched* fetched = std::get_if<Fetched>(&fetch.result);
+    if (fetched == nullptr) return std::nullopt;
+    return std::move(*fetched);
+  }
   std::optional<Dictionary> fetch(const char* name = "torvel") {
-    return fetcher_.fetchStorebagWithName(String(name), maxAge_, notModified_, &lastModified_);
+    return taken(fetcher_.fetchStorebagWithName(String(name), lastModified_));
   }
   std::optional<Dictionary> fetchSection(int32_t clientType = 5) {
-    return fetcher_.fetchStorebagForEnvironmentAndClientType(clientType, maxAge_, version_, notModified_,
-                                                             &lastModified_);
+    const auto section = taken(fetcher_.fetchStorebagForEnvironmentAndClientType(clientType, lastModified_));
+    if (!section) return std::nullopt;
+    version_ = section->version;
+    return section->contents;
   }
   int32_t maxAgeFor(const char* cacheControl) {
     serveBag(bag_, {{"Cache-Control", cacheControl}});
@@ -50,7 +64,7 @@ class StorebagFetcherTest : public ::testing::Test {
   StorebagFetcher fetcher_{test_.configuration, backendClassLock_};
   const Dictionary section_{{"httppost", Dictionary{{"active", true}}}};
   const Dictionary bag_ = releaseBag(section_);
-  int32_t maxAge_ = -77;  // not written
+  int32_t maxAge_ = -77;  // of no fetch
   bool notModified_ = false;
   std::optional<String> version_, lastModified_;
 };
@@ -144,14 +158,25 @@ TEST_F(StorebagFetcherTest, AnEmptyReplyWithADateMeansUnchangedWhateverItsStatus
   EXPECT_EQ(maxAge_, 86400);
 }
 
-TEST_F(StorebagFetcherTest, WithoutAPlaceForTheDateIsUnconditionalAndNeverUnchanged) {
+TEST_F(StorebagFetcherTest, WithoutADateIsUnconditionalAndNeverUnchanged) {
   serveBag(bag_, {{"Last-Modified", "today"}});
-  EXPECT_EQ(fetcher_.fetchStorebagWithName(String("torvel"), maxAge_, notModified_, nullptr), bag_);
+  EXPECT_EQ(fetch(), bag_);
   EXPECT_TRUE(test_.urlSessions.lastRequest().headers.empty());
+  lastModified_.reset();
   serve({200, {{"Last-Modified", "today"}}, "", std::nullopt});
-  EXPECT_FALSE(fetcher_.fetchStorebagWithName(String("torvel"), maxAge_, notModified_, nullptr));
+  EXPECT_FALSE(fetch());
+  EXPECT_TRUE(test_.urlSessions.lastRequest().headers.empty());
   EXPECT_FALSE(notModified_);
-  EXPECT_EQ(test_.sink.count("Last-Modified"), 0U);
+  EXPECT_EQ(test_.sink.count("Adding 'Last-Modified"), 0U);
+}
+
+TEST_F(StorebagFetcherTest, AReplyCountsForAgeAndDateEvenIfItsBagIsNotGood) {
+  lastModified_ = String("yesterday");
+  serve({200, {{"Last-Modified", "today"}, {"Cache-Control", "max-age=60"}}, "rubbish", std::nullopt});
+  EXPECT_FALSE(fetchSection());
+  EXPECT_FALSE(notModified_);
+  EXPECT_EQ(maxAge_, 60);
+  EXPECT_EQ(lastModified_, String("today"));
 }
 
 TEST_F(StorebagFetcherTest, DoesNotTakeAnEmptyReplyForUnchangedWithoutADate) {
@@ -169,10 +194,13 @@ TEST_F(StorebagFetcherTest, DoesNotTakeAnEmptyReplyForUnchangedOnAFirstFetch) {
   EXPECT_EQ(lastModified_, String("today"));
 }
 
-TEST_F(StorebagFetcherTest, LogsATransportFailureAndLeavesTheMaximumAge) {
+TEST_F(StorebagFetcherTest, LogsATransportFailureAndLeavesNoAgeAndTheDateAskedWith) {
+  lastModified_ = String("yesterday");
   serveNothing();
   EXPECT_FALSE(fetch());
-  EXPECT_EQ(maxAge_, -77);
+  EXPECT_FALSE(notModified_);
+  EXPECT_EQ(maxAge_, 0);
+  EXPECT_EQ(lastModified_, String("yesterday"));
   EXPECT_TRUE(test_.sink.contains(
       LogLevel::normal, std::string("fetchStorebagWithName: Error resolving with lookup server ") + kURL +
                             "/torvel?version=8.0, sendSynchronousRequest error no such host"));

@@ -1,0 +1,82 @@
+// Waiting for a request, over the URL session in memory.
+#include "platform/URLSession.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <memory>
+#include <optional>
+#include <thread>
+#include <utility>
+
+#include "platform/fake/FakeURLSession.h"
+
+namespace kyt {
+namespace {
+
+class StartAndWait : public ::testing::Test {
+ protected:
+  URLReply fetch() {
+    URLRequest request;
+    request.url = "https://example.org/file";
+    return startAndWait(std::move(request), [this](URLRequest sent, URLCompletion completion) {
+      session_->start(std::move(sent), std::move(completion));
+    });
+  }
+
+  FakeURLSessionFactory factory_;
+  std::unique_ptr<URLSession> session_ = factory_.create({});
+};
+
+TEST_F(StartAndWait, ReturnsWhatTheCompletionWasCalledWith) {
+  factory_.setResponder([](const URLRequest&) {
+    return FakeURLSessionFactory::Reply{404, {{"Server", "one"}}, "not here", std::nullopt};
+  });
+  const URLReply reply = fetch();
+  EXPECT_EQ(reply.data, Data("not here"));
+  ASSERT_TRUE(reply.response);
+  EXPECT_EQ(reply.response->status, 404);
+  EXPECT_EQ(reply.response->header("server"), "one");
+  EXPECT_FALSE(reply.error);
+  EXPECT_EQ(factory_.lastRequest().url, "https://example.org/file");
+}
+
+TEST_F(StartAndWait, ReturnsTheErrorOfARequestThatFailed) {
+  factory_.setResponder([](const URLRequest&) {
+    return FakeURLSessionFactory::Reply{0, {}, "", Error{kKYTURLErrorDomain, 6, "no such host"}};
+  });
+  const URLReply reply = fetch();
+  EXPECT_FALSE(reply.data);
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(reply.error->localizedDescription, "no such host");
+}
+
+TEST_F(StartAndWait, WaitsUntilTheCompletionHasRunOnAnotherThread) {
+  std::atomic<bool> returned{false};
+  URLReply reply;
+  std::thread caller([&] {
+    reply = fetch();
+    returned = true;
+  });
+  EXPECT_TRUE(factory_.waitForRequests(1));
+  EXPECT_FALSE(returned);
+  EXPECT_TRUE(factory_.complete(0, 200, {}, "late"));
+  caller.join();
+  EXPECT_EQ(reply.data, Data("late"));
+}
+
+TEST_F(StartAndWait, IsEndedByTheShutDownLikeAllThatThreadsWaitFor) {
+  URLReply reply;
+  std::thread caller([&] { reply = fetch(); });
+  EXPECT_TRUE(factory_.waitForRequests(1));
+  EXPECT_TRUE(factory_.lastRequest().isAwaited);
+  factory_.cancelAwaited();
+  EXPECT_FALSE(factory_.isOpen(0));
+  factory_.cancelAll();  // whatever was expected, the test ends
+  caller.join();
+  ASSERT_TRUE(reply.error);
+  EXPECT_EQ(reply.error->code, kURLErrorCancelled);
+}
+
+}  // namespace
+}  // namespace kyt
