@@ -13,6 +13,7 @@ from intruder import become_another, intrude
 from stage import Failure
 
 STEADY, WILD, INTRUDERS = 3, 4, 3
+STALL_SECONDS = 20  # of waiting for a steady program after its time
 # An event may be lost with the moment that a fault takes. Before the moment: what its session has batched, or is on its
 # way; sessions live for some times their mean at most. After it: a session that came meanwhile goes on without what was
 # refused to it.
@@ -90,8 +91,7 @@ class Round:
             self.disturb()
         seconds = time.monotonic() - begin
         self.mend()
-        for nonce, process, _, _ in self.steady:
-            self.wait(nonce, process, 300)
+        self.wait_for_steady()
         pacer.end()
         # Daemons that have ended meanwhile took their figures with them.
         self.load = None if ends else tuple(
@@ -135,6 +135,7 @@ class Round:
         self.failed_calls[name] = self.failed_calls.get(name, 0) + count
         if count:
             self.moments.append((begin, time.monotonic()))
+            self.stage.reader.write(f"soak: {name} failed {count} times in the last {time.monotonic() - begin:.3f} s\n")
 
     def disturb(self):
         stage, draw = self.stage, self.draw
@@ -180,6 +181,17 @@ class Round:
         if os.path.isfile(logs):
             os.unlink(logs)
         stage.write("etc/kytreportingd/entitlements.d/other.toml", "")
+
+    def wait_for_steady(self):
+        """They end soon after their time, unless the daemon leaves one of them without an answer."""
+        begin, told = time.monotonic(), False
+        for nonce, process, _, _ in self.steady:
+            while process.poll() is None and time.monotonic() < begin + STALL_SECONDS:
+                time.sleep(0.05)
+            if process.poll() is None and not told:
+                told = True
+                self.stage.note_stall(STALL_SECONDS)
+            self.wait(nonce, process, 300)
 
     def kill(self):
         """Whatever of it still runs, where it broke off."""

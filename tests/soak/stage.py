@@ -35,6 +35,8 @@ class LogReader(threading.Thread):
         self.last, self.reports = [], []
         self.counters, self.requests = {}, None
         self.started = threading.Event()
+        self.begin = time.monotonic()
+        self.lock = threading.Lock()
         self.file = open(path, "a", errors="replace")
 
     def run(self):
@@ -47,9 +49,15 @@ class LogReader(threading.Thread):
                 self.started.set()
             if "shutDown: " in line:
                 self.read_figure(line)
-            if self.file.tell() < 1 << 28:
-                self.file.write(line)
-        self.file.close()
+            self.write(line)
+        with self.lock:
+            self.file.close()
+
+    def write(self, line):
+        """To the file, behind the seconds since the daemon's start at which it was read, or came from elsewhere."""
+        with self.lock:
+            if not self.file.closed and self.file.tell() < 1 << 28:
+                self.file.write(f"{time.monotonic() - self.begin:9.3f} {line}")
 
     def read_figure(self, line):
         """One of the lines in which a daemon that ends says what it has done."""
@@ -245,6 +253,15 @@ class Stage:
             with open(f"/proc/{self.daemon.pid}/task/{task}/children") as file:
                 found += file.read().split()
         return found
+
+    def note_stall(self, seconds):
+        """Where the daemon's threads are goes to its log, as far as there is a program that tells."""
+        self.reader.write(f"soak: a steady program has not ended {seconds:.0f} s after its time\n")
+        if shutil.which("gdb"):
+            stacks = subprocess.run(["timeout", "60", "gdb", "-p", str(self.daemon.pid), "-batch", "-ex",
+                                     "set pagination off", "-ex", "thread apply all backtrace 16"],
+                                    stdin=subprocess.DEVNULL, capture_output=True, text=True, errors="replace")
+            self.reader.write(stacks.stdout + "\n")
 
     def heard(self):
         """Requests that came whole to either server."""
