@@ -4,12 +4,15 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
 #include <memory>
 #include <optional>
 #include <thread>
 #include <utility>
 
 #include "platform/fake/FakeURLSession.h"
+#include "platform/queues/Semaphore.h"
+#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {
@@ -51,14 +54,29 @@ TEST_F(StartAndWait, ReturnsTheErrorOfARequestThatFailed) {
   EXPECT_EQ(reply.error->localizedDescription, "no such host");
 }
 
+// Tells when its thread begins to wait.
+class Waiting final : public BlockingObserver {
+ public:
+  explicit Waiting(Semaphore& begun) : begun_(begun) {}
+  void willBlock() override { begun_.signal(); }
+  void hasBlocked() override {}
+
+ private:
+  Semaphore& begun_;
+};
+
 TEST_F(StartAndWait, WaitsUntilTheCompletionHasRunOnAnotherThread) {
+  Semaphore begun;
   std::atomic<bool> returned{false};
   URLReply reply;
   std::thread caller([&] {
+    Waiting waiting(begun);
+    BlockingObserver* former = BlockingObserver::exchange(&waiting);
     reply = fetch();
     returned = true;
+    BlockingObserver::exchange(former);
   });
-  EXPECT_TRUE(factory_.waitForRequests(1));
+  EXPECT_TRUE(begun.waitFor(std::chrono::seconds(30)));
   EXPECT_FALSE(returned);
   EXPECT_TRUE(factory_.complete(0, 200, {}, "late"));
   caller.join();
