@@ -102,6 +102,7 @@ class WorkerPool::Implementation {
   size_t borrowed_ GUARDED_BY(mutex_) = 0;  // queues that threads of others run
   bool stopping_ GUARDED_BY(mutex_) = false;
   bool insists_ GUARDED_BY(mutex_) = true;
+  bool workedSinceQuiet_ GUARDED_BY(mutex_) = false;
   bool mustTell_ GUARDED_BY(mutex_) = false;  // that work waited; told by the next worker, without the lock
 };
 
@@ -218,6 +219,7 @@ void WorkerPool::Implementation::work(Worker& self) {
       break;
     }
     --looking_;
+    workedSinceQuiet_ = true;
     Worker* next = workerToWake();
     const bool mustTell = std::exchange(mustTell_, false);
     mutex_.unlock();
@@ -254,13 +256,16 @@ bool WorkerPool::Implementation::sleep(Worker& self) {
   return true;
 }
 
-// The last worker's, at its end. Work that came meanwhile may have found no thread, and counted on this one.
+// Of a worker that ends for want of work. A program that goes on reporting keeps one worker for ever, so the pool is
+// quiet too when the last but one ends: the load that needed two is over. Work that came meanwhile may have found no
+// thread, and counted on this one.
 bool WorkerPool::Implementation::hasWorkAfterQuiet() {
-  if (workers_ != 1 || stopping_ || options_.whenQuiet == nullptr) return false;
+  if (workers_ > 2 || stopping_ || options_.whenQuiet == nullptr || !workedSinceQuiet_) return false;
+  workedSinceQuiet_ = false;
   mutex_.unlock();
   options_.whenQuiet();
   mutex_.lock();
-  if (workers_ != 1 || stopping_ || ready_.empty()) return false;
+  if (stopping_ || ready_.empty()) return false;
   ++running_;
   ++looking_;
   return true;

@@ -31,9 +31,11 @@ struct WorkerPoolOptions {
   Duration idleExit = std::chrono::seconds(10);
   const char* name = "kyt-worker";                 // at most 11 bytes; a number follows
   void (*nameThread)(const char* name) = nullptr;  // how the operating system is told a thread's name
-  void (*whenQuiet)() = nullptr;  // called by the last worker when it ends for want of work, no lock held
-  Counters* counters = nullptr;   // Reason::workersExhausted, each time a queue must wait for a limit
-  Log* log = nullptr;             // with `counters`: a line about that, at most once a minute
+  // Called by a worker that ends for want of work when at most one is left, and any has worked since the last call. No
+  // lock is held.
+  void (*whenQuiet)() = nullptr;
+  Counters* counters = nullptr;  // Reason::workersExhausted, each time a queue must wait for a limit
+  Log* log = nullptr;            // with `counters`: a line about that, at most once a minute
 };
 
 struct WorkerPoolFigures {

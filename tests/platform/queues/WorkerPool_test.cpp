@@ -87,6 +87,33 @@ TEST(WorkerPool, SaysOnceThatItIsQuietWhereSeveralWorkersEnd) {
   EXPECT_EQ(timesQuiet, 1);
 }
 
+// A program that goes on reporting leaves no moment without a worker.
+TEST(WorkerPool, SaysThatItIsQuietAlsoWhileOneWorkerGoesOn) {
+  WorkerPoolOptions o = options(2);
+  o.idleExit = std::chrono::milliseconds(200);
+  o.whenQuiet = [] { ++timesQuiet; };
+  timesQuiet = 0;
+  WorkerPool pool(o);
+  auto one = SerialQueue::create("one", pool), other = SerialQueue::create("other", pool);
+  Semaphore running, goOn;
+  for (const auto& queue : {one, other})
+    queue->async([&] {
+      running.signal();
+      goOn.wait();
+    });
+  ASSERT_TRUE(running.waitFor(kDeadline) && running.waitFor(kDeadline));
+  goOn.signal();
+  Semaphore still;
+  other->async([&] {  // keeps its worker, or the other queue's, until the pool is quiet
+    running.signal();
+    still.wait();
+  });
+  goOn.signal();
+  ASSERT_TRUE(running.waitFor(kDeadline));
+  EXPECT_TRUE(eventually([&] { return timesQuiet == 1 && pool.figures().workers == 1; }));
+  still.signal();
+}
+
 // Work that comes while the last worker says so is done, also where the system refuses another.
 TEST(WorkerPool, WorkThatComesWhileItGetsQuietIsDone) {
   static Semaphore quiet, goOn;
