@@ -93,9 +93,9 @@ TEST(WorkerPool, SaysThatItIsQuietAlsoWhileOneWorkerGoesOn) {
   o.idleExit = std::chrono::milliseconds(200);
   o.whenQuiet = [] { ++timesQuiet; };
   timesQuiet = 0;
+  Semaphore running, goOn, still;  // outlive the workers
   WorkerPool pool(o);
   auto one = SerialQueue::create("one", pool), other = SerialQueue::create("other", pool);
-  Semaphore running, goOn;
   for (const auto& queue : {one, other})
     queue->async([&] {
       running.signal();
@@ -103,7 +103,6 @@ TEST(WorkerPool, SaysThatItIsQuietAlsoWhileOneWorkerGoesOn) {
     });
   ASSERT_TRUE(running.waitFor(kDeadline) && running.waitFor(kDeadline));
   goOn.signal();
-  Semaphore still;
   other->async([&] {  // keeps its worker, or the other queue's, until the pool is quiet
     running.signal();
     still.wait();
