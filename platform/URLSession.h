@@ -3,9 +3,10 @@
 //
 // start() may be called from any thread and never blocks. A completion runs exactly once, on the URL session's own
 // serial delegate queue, never on the caller's thread before start() has returned, never on the network thread.
-// A request other than GET and HEAD is sent again by itself only where the server's TCP has acknowledged not a byte of it.
-// Only http and https; TLS 1.2 or newer, always verified; no cookies, no cache. 60 s without progress is a time-out,
-// and so is an attempt that takes longer than `Limits::requestSeconds` and what its body may take; a reply body over `Limits::maxHTTPReplyBytes` is an error.
+// A request other than GET and HEAD is sent again by itself only where the server's TCP has acknowledged not a byte of
+// it. Only http and https; TLS 1.2 or newer, always verified; no cookies, no cache. 60 s without progress is a
+// time-out, and so is an attempt that takes longer than `Limits::requestSeconds` and what its body may take; a reply
+// body over `Limits::maxHTTPReplyBytes` is an error.
 #pragma once
 
 #include <atomic>

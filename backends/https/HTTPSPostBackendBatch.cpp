@@ -176,10 +176,9 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
   return true;
 }
 
-// The records that the lists admit, each with the user information of now, filtered, over what it had.
-// User information that came after the records makes every one of them
-// larger, and must not make of a batch within its limit a message past all bounds: then the newest are
-// dropped.
+// The records that the lists admit, each with the user information of now, filtered, over what it had. User information
+// that came after the records makes every one of them larger, and must not make of a batch within its limit a message
+// past all bounds: then the newest are dropped.
 Array HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const {
   Dictionary information;
   if (userInfo() != nullptr) information = *userInfo();
