@@ -8,27 +8,17 @@ namespace kyt {
 
 namespace {
 
-constexpr int kOK = 0;
-constexpr int kStreamEnd = 1;
-constexpr int kFileError = -1;
-constexpr int kStreamError = -2;
-constexpr int kDataError = -3;
-constexpr int kMemoryError = -4;
-constexpr int kBufferError = -5;
-constexpr int kVersionError = -6;
-
-constexpr int kDefaultLevel = -1;
 constexpr int kGzipWindowBits = 31;  // 32 KiB window, gzip wrapper
 constexpr int kZlibWindowBits = 15;
 constexpr int kMemoryLevel = 8;
 
 const char* initializationErrorText(int code) {
   switch (code) {
-    case kVersionError:
+    case DeflateCode::versionError:
       return "The version of zlib.h and the version of the library linked do not match.";
-    case kMemoryError:
+    case DeflateCode::memoryError:
       return "Insufficient memory.";
-    case kStreamError:
+    case DeflateCode::streamError:
       return "Invalid parameter passed in to function.";
     default:
       return "Unknown error code.";
@@ -37,17 +27,17 @@ const char* initializationErrorText(int code) {
 
 const char* deflateErrorText(int code) {
   switch (code) {
-    case kVersionError:
+    case DeflateCode::versionError:
       return "The version of zlib.h and the version of the library linked do not match.";
-    case kBufferError:
+    case DeflateCode::bufferError:
       return "Ran out of output buffer for writing compressed bytes.";
-    case kMemoryError:
+    case DeflateCode::memoryError:
       return "Memory could not be allocated for processing.";
-    case kDataError:
+    case DeflateCode::dataError:
       return "The deflate data was invalid or incomplete.";
-    case kStreamError:
+    case DeflateCode::streamError:
       return "The stream state was inconsistent (e.g., next_in or next_out was NULL).";
-    case kFileError:
+    case DeflateCode::fileError:
       return "Error occured while reading file.";
     default:
       return "Unknown error code.";
@@ -67,10 +57,10 @@ std::optional<Data> compressDataWithZlibOrGzip(Platform& platform, bool gzip, By
     return std::nullopt;
   }
   const std::unique_ptr<DeflateStream> stream = platform.deflate.newStream();
-  int code = kMemoryError;
+  int code = DeflateCode::memoryError;
   if (stream != nullptr)
-    code = stream->initialize(kDefaultLevel, gzip ? kGzipWindowBits : kZlibWindowBits, kMemoryLevel);
-  if (code != kOK) {
+    code = stream->initialize(kDeflateDefaultLevel, gzip ? kGzipWindowBits : kZlibWindowBits, kMemoryLevel);
+  if (code != DeflateCode::ok) {
     platform.log.error("compressDataWithZlibOrGzip: deflateInit2() Error: \"%s\" Message: \"%s\"",
                        initializationErrorText(code), messageText(stream.get()));
     return std::nullopt;
@@ -81,8 +71,8 @@ std::optional<Data> compressDataWithZlibOrGzip(Platform& platform, bool gzip, By
   Bytes rest = input;
   do {
     code = stream->finish(rest, space);
-  } while (code == kOK);
-  if (code != kStreamEnd) {
+  } while (code == DeflateCode::ok);
+  if (code != DeflateCode::streamEnd) {
     platform.log.error(
         "compressDataWithZlibOrGzip: zlib error while attempting compression: \"%s\" Message: \"%s\"",
         deflateErrorText(code), messageText(stream.get()));

@@ -16,6 +16,7 @@
 #include "platform/linux/base/UnixSocket.h"
 #include "platform/linux/confinement/Capabilities.h"
 #include "platform/linux/confinement/LinuxConfinement.h"
+#include "platform/linux/data/MakeDeflate.h"
 #include "platform/linux/files/Files.h"
 #include "platform/linux/helpers/DeletionBroker.h"
 #include "platform/linux/helpers/ProgramInspector.h"
@@ -126,8 +127,8 @@ int waitForTheEnd(StopSignals& signals, Log& log) {
 }
 
 int serve(const Settings& settings, const Paths& paths, Log& log, Counters& counters,
-          ProgramInspector& inspector, const DeletionBroker* broker, uint64_t memory,
-          Confinement& confinement, StopSignals& stopSignals) {
+          ProgramInspector& inspector, const DeletionBroker* broker, std::unique_ptr<Deflate> deflate,
+          uint64_t memory, Confinement& confinement, StopSignals& stopSignals) {
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -147,8 +148,8 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
   }
   log.allowThreads();
   DaemonServices services({settings, paths, log, counters, inspector, broker, std::move(reactor),
-                           std::move(acceptor), activated, memory, LinuxConfinement::descriptorLimit(),
-                           [&stopSignals] { stopSignals.request(); }});
+                           std::move(acceptor), std::move(deflate), activated, memory,
+                           LinuxConfinement::descriptorLimit(), [&stopSignals] { stopSignals.request(); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
@@ -201,6 +202,7 @@ int runDaemon(const DaemonOptions& options) {
     return kCouldNotStart;
   }
   log.normal("startLogging: Daemon starts logging...");
+  std::unique_ptr<Deflate> deflate = makeDeflate(settings.compression, log);
   LinuxConfinement confinement = confinementOf(paths, settings, logs);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
@@ -212,7 +214,8 @@ int runDaemon(const DaemonOptions& options) {
   logWhatIsNotEnforced(confinement, log);
   log.debug("main: At most %llu descriptors",
             static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
-  return serve(settings, paths, log, counters, *inspector, broker.get(), memory, confinement, stopSignals);
+  return serve(settings, paths, log, counters, *inspector, broker.get(), std::move(deflate), memory,
+               confinement, stopSignals);
 }
 
 }  // namespace kyt

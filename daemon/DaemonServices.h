@@ -14,6 +14,7 @@
 #include "config/Environment.h"
 #include "config/StorebagFetcher.h"
 #include "daemon/ReportingdAgent.h"
+#include "platform/Deflate.h"
 #include "platform/Entitlements.h"
 #include "platform/Platform.h"
 #include "platform/base/Counters.h"
@@ -30,7 +31,6 @@
 #include "platform/linux/data/OpenSSLCryptography.h"
 #include "platform/linux/data/PugixmlPropertyLists.h"
 #include "platform/linux/data/RapidJSON.h"
-#include "platform/linux/data/ZlibDeflate.h"
 #include "platform/linux/device/LinuxDeviceProperties.h"
 #include "platform/linux/device/TomlUserDefaults.h"
 #include "platform/linux/entitlements/TomlEntitlements.h"
@@ -64,6 +64,7 @@ class DaemonServices {
     const DeletionBroker* broker;  // null: uploaded files stay
     std::unique_ptr<EpollReactor> reactor;
     std::unique_ptr<StreamAcceptor> acceptor;
+    std::unique_ptr<Deflate> deflate;
     bool socketActivated = false;
     uint64_t memory = 0;       // bytes and
     uint64_t descriptors = 0;  // descriptors that the daemon may use, for the shares of users
@@ -105,7 +106,7 @@ class DaemonServices {
   OpenSSLCryptography cryptography_;
   PugixmlPropertyLists propertyLists_;
   RapidJSON json_;
-  ZlibDeflate deflate_;
+  const std::unique_ptr<Deflate> deflate_;
   TomlUserDefaults userDefaults_;
   LinuxDeviceProperties deviceProperties_;
   DefaultsDiagnosticsConsent consent_;

@@ -30,6 +30,7 @@ void settings(std::string_view text) {
   if (const auto* error = std::get_if<TomlError>(&result)) return check(*error);
   const auto& settings = std::get<Settings>(result);
   require(!settings.storebagInternalHost.empty() && !settings.storebagPublicHost.ends_with('/'));
+  require(settings.compression.level >= 1 && settings.compression.level <= 9);
   require(settings.limits.maxMessageBytes >= 1 && settings.limits.idleExitSeconds >= 0);
 }
 

@@ -10,6 +10,14 @@
 namespace kyt {
 
 enum class LogTarget { automatic, journal, standardError };
+enum class CompressionLibrary { zlib, libdeflate };
+
+// Of request bodies.
+struct CompressionSettings {
+  CompressionLibrary library = CompressionLibrary::zlib;
+  int level = 6;  // 1 to 9: the quickest to the smallest
+  friend bool operator==(const CompressionSettings&, const CompressionSettings&) = default;
+};
 
 struct Settings {
   // Storebag hosts as addresses without a trailing slash ("https://bags.example.org"); the paths are
@@ -20,6 +28,7 @@ struct Settings {
   std::vector<std::string> cellularInterfaces;  // glob patterns of interface names
   Limits limits;
   LogTarget logTarget = LogTarget::automatic;
+  CompressionSettings compression;
   friend bool operator==(const Settings&, const Settings&) = default;
 };
 

@@ -33,6 +33,7 @@ class FaultyDeflate : public Deflate {
 
   explicit FaultyDeflate(Deflate* inner = nullptr) : inner_(inner) {}
   [[nodiscard]] std::unique_ptr<DeflateStream> newStream() override;
+  void standInFrontOf(Deflate& inner) { inner_ = &inner; }
 
   Faults faults;
   Calls calls;

@@ -1,9 +1,10 @@
-// Compression of request bodies, against zlib's own inflate, and each failure of it.
+// Compression of request bodies with each library, against zlib's own inflate, and each failure of it.
 #include "backend/PayloadCompression.h"
 
 #include <gtest/gtest.h>
 #include <zlib.h>
 
+#include "tests/support/DeflateLibraries.h"
 #include "tests/support/TestPlatform.h"
 
 namespace kyt {
@@ -28,23 +29,35 @@ std::string inflated(const Data& data, int windowBits, size_t expected) {
   return code == Z_STREAM_END && stream.avail_in == 0 ? out : std::string();
 }
 
-class PayloadCompressionTest : public testing::Test {
+class CompressingPlatform {
  protected:
+  explicit CompressingPlatform(const DeflateLibrary& library) : library_(library.make(6)) {
+    platform_.deflate.standInFrontOf(*library_);
+  }
   std::vector<std::string> errors() const {
     std::vector<std::string> texts;
     for (const auto& line : platform_.sink.lines())
       if (line.level == LogLevel::error) texts.push_back(line.line);
     return texts;
   }
+  const std::unique_ptr<Deflate> library_;
   TestPlatform platform_;
 };
 
-TEST_F(PayloadCompressionTest, RefusesAnEmptyBuffer) {
+class PayloadCompressionTest : public testing::TestWithParam<DeflateLibrary>, protected CompressingPlatform {
+ protected:
+  PayloadCompressionTest() : CompressingPlatform(GetParam()) {}
+};
+
+INSTANTIATE_TEST_SUITE_P(EachLibrary, PayloadCompressionTest, testing::ValuesIn(kDeflateLibraries),
+                         nameOfLibrary);
+
+TEST_P(PayloadCompressionTest, RefusesAnEmptyBuffer) {
   EXPECT_FALSE(gzipDeflate(platform_.platform, {}));
   EXPECT_EQ(errors(), std::vector<std::string>{"compressDataWithZlibOrGzip: Cannot compress empty Bytebuf"});
 }
 
-TEST_F(PayloadCompressionTest, MakesAGzipStreamThatZlibReads) {
+TEST_P(PayloadCompressionTest, MakesAGzipStreamThatZlibReads) {
   const std::string input(10000, 'k');
   const std::optional<Data> output = gzipDeflate(platform_.platform, bytesOf(input));
   ASSERT_TRUE(output);
@@ -59,7 +72,7 @@ TEST_F(PayloadCompressionTest, MakesAGzipStreamThatZlibReads) {
   EXPECT_EQ(platform_.deflate.calls.ended, 1);
 }
 
-TEST_F(PayloadCompressionTest, MakesAZlibStreamWithA32KiBWindow) {
+TEST_P(PayloadCompressionTest, MakesAZlibStreamWithA32KiBWindow) {
   const std::optional<Data> output =
       compressDataWithZlibOrGzip(platform_.platform, false, bytesOf("telemetry"));
   ASSERT_TRUE(output);
@@ -67,14 +80,14 @@ TEST_F(PayloadCompressionTest, MakesAZlibStreamWithA32KiBWindow) {
   EXPECT_EQ(inflated(*output, 15, 9), "telemetry");
 }
 
-TEST_F(PayloadCompressionTest, CompressesWhatDoesNotShrink) {
+TEST_P(PayloadCompressionTest, CompressesWhatDoesNotShrink) {
   const std::optional<Data> output = gzipDeflate(platform_.platform, bytesOf("x"));
   ASSERT_TRUE(output);
   EXPECT_GT(output->size(), 1u);
   EXPECT_EQ(inflated(*output, 31, 1), "x");
 }
 
-TEST_F(PayloadCompressionTest, KeepsNoMoreMemoryThanTheOutputTakes) {
+TEST_P(PayloadCompressionTest, KeepsNoMoreMemoryThanTheOutputTakes) {
   const std::string input(100000, 'k');
   const std::optional<Data> output = gzipDeflate(platform_.platform, bytesOf(input));
   ASSERT_TRUE(output);
@@ -86,52 +99,62 @@ struct ErrorText {
   const char* text;
 };
 
-class InitializationErrorTest : public PayloadCompressionTest,
-                                public testing::WithParamInterface<ErrorText> {};
+using LibraryAndError = std::tuple<DeflateLibrary, ErrorText>;
+
+class CompressionErrorTest : public testing::TestWithParam<LibraryAndError>, protected CompressingPlatform {
+ protected:
+  CompressionErrorTest() : CompressingPlatform(std::get<DeflateLibrary>(GetParam())) {}
+  static const ErrorText& wanted() { return std::get<ErrorText>(GetParam()); }
+};
+
+class InitializationErrorTest : public CompressionErrorTest {};
 
 TEST_P(InitializationErrorTest, IsLoggedWithItsText) {
-  platform_.deflate.faults.initialize = GetParam().code;
+  platform_.deflate.faults.initialize = wanted().code;
   platform_.deflate.faults.message = "broken";
   EXPECT_FALSE(gzipDeflate(platform_.platform, bytesOf("x")));
   EXPECT_EQ(errors(),
             std::vector<std::string>{std::string("compressDataWithZlibOrGzip: deflateInit2() Error: \"") +
-                                     GetParam().text + "\" Message: \"broken\""});
+                                     wanted().text + "\" Message: \"broken\""});
 }
 
 INSTANTIATE_TEST_SUITE_P(
     EveryCode, InitializationErrorTest,
-    testing::Values(ErrorText{-6,
-                              "The version of zlib.h and the version of the library linked do not match."},
-                    ErrorText{-5, "Unknown error code."}, ErrorText{-4, "Insufficient memory."},
-                    ErrorText{-3, "Unknown error code."},
-                    ErrorText{-2, "Invalid parameter passed in to function."},
-                    ErrorText{-1, "Unknown error code."}, ErrorText{-99, "Unknown error code."}));
+    testing::Combine(
+        testing::ValuesIn(kDeflateLibraries),
+        testing::Values(
+            ErrorText{-6, "The version of zlib.h and the version of the library linked do not match."},
+            ErrorText{-5, "Unknown error code."}, ErrorText{-4, "Insufficient memory."},
+            ErrorText{-3, "Unknown error code."}, ErrorText{-2, "Invalid parameter passed in to function."},
+            ErrorText{-1, "Unknown error code."}, ErrorText{-99, "Unknown error code."})));
 
-class DeflateErrorTest : public PayloadCompressionTest, public testing::WithParamInterface<ErrorText> {};
+class DeflateErrorTest : public CompressionErrorTest {};
 
 TEST_P(DeflateErrorTest, IsLoggedWithItsTextAndEndsTheStream) {
-  platform_.deflate.faults.finish = {GetParam().code};
+  platform_.deflate.faults.finish = {wanted().code};
   platform_.deflate.faults.message = "broken";
   EXPECT_FALSE(gzipDeflate(platform_.platform, bytesOf("x")));
   EXPECT_EQ(errors(),
             std::vector<std::string>{
                 std::string("compressDataWithZlibOrGzip: zlib error while attempting compression: \"") +
-                GetParam().text + "\" Message: \"broken\""});
+                wanted().text + "\" Message: \"broken\""});
   EXPECT_EQ(platform_.deflate.calls.ended, 1);
 }
 
 INSTANTIATE_TEST_SUITE_P(
     EveryCode, DeflateErrorTest,
-    testing::Values(ErrorText{-6,
-                              "The version of zlib.h and the version of the library linked do not match."},
-                    ErrorText{-5, "Ran out of output buffer for writing compressed bytes."},
-                    ErrorText{-4, "Memory could not be allocated for processing."},
-                    ErrorText{-3, "The deflate data was invalid or incomplete."},
-                    ErrorText{-2, "The stream state was inconsistent (e.g., next_in or next_out was NULL)."},
-                    ErrorText{-1, "Error occured while reading file."}, ErrorText{-99, "Unknown error code."},
-                    ErrorText{2, "Unknown error code."}));
+    testing::Combine(
+        testing::ValuesIn(kDeflateLibraries),
+        testing::Values(
+            ErrorText{-6, "The version of zlib.h and the version of the library linked do not match."},
+            ErrorText{-5, "Ran out of output buffer for writing compressed bytes."},
+            ErrorText{-4, "Memory could not be allocated for processing."},
+            ErrorText{-3, "The deflate data was invalid or incomplete."},
+            ErrorText{-2, "The stream state was inconsistent (e.g., next_in or next_out was NULL)."},
+            ErrorText{-1, "Error occured while reading file."}, ErrorText{-99, "Unknown error code."},
+            ErrorText{2, "Unknown error code."})));
 
-TEST_F(PayloadCompressionTest, GoesOnWhenDeflateAsksForMore) {
+TEST_P(PayloadCompressionTest, GoesOnWhenDeflateAsksForMore) {
   platform_.deflate.faults.finish = {0, 0};
   const std::optional<Data> output = gzipDeflate(platform_.platform, bytesOf("telemetry"));
   ASSERT_TRUE(output);
@@ -139,14 +162,14 @@ TEST_F(PayloadCompressionTest, GoesOnWhenDeflateAsksForMore) {
   EXPECT_EQ(platform_.deflate.calls.finished, 3);
 }
 
-TEST_F(PayloadCompressionTest, ReportsABoundThatIsTooSmall) {
+TEST_P(PayloadCompressionTest, ReportsABoundThatIsTooSmall) {
   platform_.deflate.faults.bound = 1;
   EXPECT_FALSE(gzipDeflate(platform_.platform, bytesOf("telemetry")));
   EXPECT_EQ(errors().size(), 1u);
   EXPECT_TRUE(platform_.sink.contains("Ran out of output buffer for writing compressed bytes."));
 }
 
-TEST_F(PayloadCompressionTest, ShowsAMissingMessageAndAMissingStream) {
+TEST_P(PayloadCompressionTest, ShowsAMissingMessageAndAMissingStream) {
   platform_.deflate.faults.noStream = true;
   EXPECT_FALSE(gzipDeflate(platform_.platform, bytesOf("x")));
   EXPECT_EQ(

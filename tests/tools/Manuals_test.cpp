@@ -163,8 +163,9 @@ TEST(ManualOfTheSettings, NamesEachSettingWithItsDefault) {
 TEST(AdministratorsGuide, NamesEachSettingWithItsDefault) {
   const std::vector<std::string> settings = settingNames();
   const std::string guide = textOf("docs/ADMINISTRATION.md");
-  EXPECT_EQ(matchesIn(guide, "\n\\| `((?:storebag|tls|network|limits|service|log)\\.[a-z_]+)` \\|"),
-            Names(settings.begin(), settings.end()));
+  EXPECT_EQ(
+      matchesIn(guide, "\n\\| `((?:storebag|tls|network|limits|service|log|compression)\\.[a-z_]+)` \\|"),
+      Names(settings.begin(), settings.end()));
   for (const std::string& name : settings) {
     if (!hasDefault(name)) continue;
     std::smatch match;
@@ -173,6 +174,15 @@ TEST(AdministratorsGuide, NamesEachSettingWithItsDefault) {
     std::erase(value, '`');
     expectDefault(name, value, "the guide");
   }
+}
+
+TEST(SettingsOfThePackages, ChooseLibdeflate) {
+  std::string text = textOf("packaging/debian/etc/kytreportingd.toml");
+  text = std::regex_replace(text, std::regex("#(internal_host|public_host)"), "$1");
+  const auto settings = parseSettings(text, "the packages' settings");
+  ASSERT_TRUE(std::holds_alternative<Settings>(settings)) << std::get<TomlError>(settings).text;
+  EXPECT_EQ(std::get<Settings>(settings).compression,
+            (CompressionSettings{CompressionLibrary::libdeflate, 5}));
 }
 
 TEST(AnotherNumberThanTheDefault, IsNoticed) {

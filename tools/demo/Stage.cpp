@@ -120,9 +120,11 @@ std::optional<Error> Stage::startServer() {
 
 std::optional<Error> Stage::writeConfiguration() {
   const std::string etc = options_.folder + "/etc/kytreportingd/";
-  const std::string settings = "[storebag]\ninternal_host = \"" + httpsBase() + "\"\npublic_host = \"" +
-                               httpsBase() + "\"\n[tls]\nca_file = \"" + options_.folder +
-                               "/server/ca.pem\"\n" + "[log]\ntarget = \"stderr\"\n" + options_.extraSettings;
+  const std::string settings =
+      "[storebag]\ninternal_host = \"" + httpsBase() + "\"\npublic_host = \"" + httpsBase() +
+      "\"\n[tls]\nca_file = \"" + options_.folder + "/server/ca.pem\"\n" + "[log]\ntarget = \"stderr\"\n" +
+      // As the packages' settings do.
+      "[compression]\nlibrary = \"libdeflate\"\nlevel = 5\n" + options_.extraSettings;
   if (auto error = writeFile(etc + "kytreportingd.toml", settings, 0644)) return error;
   // Whoever started the stage may try things out on it too.
   std::string grant = grantFor(geteuid());

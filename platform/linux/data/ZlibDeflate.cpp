@@ -14,7 +14,8 @@ namespace {
 
 class ZlibStream : public DeflateStream {
  public:
-  explicit ZlibStream(ZlibDeflate& owner) : owner_(owner) {
+  ZlibStream(Spares<ZlibDeflate::Workspace>& workspaces, int level)
+      : workspaces_(workspaces), defaultLevel_(level) {
     stream_.zalloc = allocate;
     stream_.zfree = release;
     stream_.opaque = this;
@@ -25,11 +26,13 @@ class ZlibStream : public DeflateStream {
 
   int initialize(int level, int windowBits, int memoryLevel) override {
     end();
-    workspace_ = owner_.takeWorkspace();
+    workspace_ = workspaces_.take();
+    if (workspace_ == nullptr) workspace_.reset(new (std::nothrow) std::byte[ZlibDeflate::kWorkspaceBytes]);
     used_ = 0;
+    if (level == kDeflateDefaultLevel) level = defaultLevel_;
     const int result = deflateInit2(&stream_, level, Z_DEFLATED, windowBits, memoryLevel, Z_DEFAULT_STRATEGY);
     initialized_ = result == Z_OK;
-    if (!initialized_) owner_.giveBack(std::move(workspace_));
+    if (!initialized_) workspaces_.giveBack(std::move(workspace_));
     return result;
   }
 
@@ -56,7 +59,7 @@ class ZlibStream : public DeflateStream {
   void end() override {
     if (!initialized_) return;
     deflateEnd(&stream_);
-    owner_.giveBack(std::move(workspace_));
+    workspaces_.giveBack(std::move(workspace_));
     initialized_ = false;
   }
 
@@ -84,7 +87,8 @@ class ZlibStream : public DeflateStream {
     if (!inside) std::free(piece);
   }
 
-  ZlibDeflate& owner_;
+  Spares<ZlibDeflate::Workspace>& workspaces_;
+  const int defaultLevel_;
   ZlibDeflate::Workspace workspace_;
   size_t used_ = 0;  // of the workspace
   z_stream stream_{};
@@ -94,30 +98,7 @@ class ZlibStream : public DeflateStream {
 }  // namespace
 
 std::unique_ptr<DeflateStream> ZlibDeflate::newStream() {
-  return std::make_unique<ZlibStream>(*this);
-}
-
-ZlibDeflate::Workspace ZlibDeflate::takeWorkspace() {
-  {
-    MutexLock lock(mutex_);
-    if (!workspaces_.empty()) {
-      Workspace workspace = std::move(workspaces_.back());
-      workspaces_.pop_back();
-      return workspace;
-    }
-  }
-  return Workspace(new (std::nothrow) std::byte[kWorkspaceBytes]);
-}
-
-void ZlibDeflate::giveBack(Workspace workspace) {
-  if (workspace == nullptr) return;
-  MutexLock lock(mutex_);
-  if (workspaces_.size() < kMostKept) workspaces_.push_back(std::move(workspace));
-}
-
-size_t ZlibDeflate::kept() const {
-  MutexLock lock(mutex_);
-  return workspaces_.size();
+  return std::make_unique<ZlibStream>(workspaces_, level_);
 }
 
 }  // namespace kyt

@@ -5,11 +5,11 @@
 // ones, few, since that many bodies are rarely compressed at the same moment.
 #pragma once
 
+#include <cstddef>
 #include <memory>
-#include <vector>
 
 #include "platform/Deflate.h"
-#include "platform/base/Mutex.h"
+#include "platform/linux/data/Spares.h"
 
 namespace kyt {
 
@@ -18,21 +18,19 @@ class ZlibDeflate : public Deflate {
   static constexpr size_t kWorkspaceBytes = 288u << 10;  // what the usual settings take, and some room
   static constexpr size_t kMostKept = 3;
 
-  ZlibDeflate() = default;
+  using Workspace = std::unique_ptr<std::byte[]>;
+
+  // `level` is what kDeflateDefaultLevel stands for: 1 to 9.
+  explicit ZlibDeflate(int level = 6) : level_(level) {}
   ZlibDeflate(const ZlibDeflate&) = delete;
   ZlibDeflate& operator=(const ZlibDeflate&) = delete;
-  ~ZlibDeflate() override = default;  // no stream may be left
+  ~ZlibDeflate() override = default;
   [[nodiscard]] std::unique_ptr<DeflateStream> newStream() override;
-  [[nodiscard]] size_t kept() const EXCLUDES(mutex_);
-
-  using Workspace = std::unique_ptr<std::byte[]>;
-  // For streams. Null when there is no memory.
-  [[nodiscard]] Workspace takeWorkspace() EXCLUDES(mutex_);
-  void giveBack(Workspace workspace) EXCLUDES(mutex_);
+  [[nodiscard]] size_t kept() const { return workspaces_.kept(); }
 
  private:
-  mutable Mutex mutex_;
-  std::vector<Workspace> workspaces_ GUARDED_BY(mutex_);
+  const int level_;
+  Spares<Workspace> workspaces_{kMostKept};
 };
 
 }  // namespace kyt

@@ -100,6 +100,25 @@ const char* setLogTarget(const TomlNode& node, Settings& settings) {
   return nullptr;
 }
 
+const char* setCompressionLibrary(const TomlNode& node, Settings& settings) {
+  const std::string* text = node.text();
+  if (text != nullptr && *text == "zlib") {
+    settings.compression.library = CompressionLibrary::zlib;
+  } else if (text != nullptr && *text == "libdeflate") {
+    settings.compression.library = CompressionLibrary::libdeflate;
+  } else {
+    return "must be \"zlib\" or \"libdeflate\"";
+  }
+  return nullptr;
+}
+
+const char* setCompressionLevel(const TomlNode& node, Settings& settings) {
+  const auto* number = std::get_if<int64_t>(&node.value);
+  if (number == nullptr || *number < 1 || *number > 9) return "must be a whole number from 1 to 9";
+  settings.compression.level = static_cast<int>(*number);
+  return nullptr;
+}
+
 struct Setting {
   std::string_view section, key;
   Setter set;
@@ -127,6 +146,8 @@ constexpr Setting kSettings[] = {
     {"service", "idle_exit_seconds", setSeconds<&Limits::idleExitSeconds>},
     {"service", "shutdown_grace_seconds", setSeconds<&Limits::shutdownGraceSeconds>},
     {"log", "target", setLogTarget},
+    {"compression", "library", setCompressionLibrary},
+    {"compression", "level", setCompressionLevel},
 };
 
 bool isSection(std::string_view name) {

@@ -32,6 +32,7 @@ TEST(TomlSettings, TheTwoHostsAreEnough) {
   EXPECT_EQ(settings.caFile, "");
   EXPECT_TRUE(settings.cellularInterfaces.empty());
   EXPECT_EQ(settings.logTarget, LogTarget::automatic);
+  EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::zlib, 6}));
   const Limits defaults;
   EXPECT_EQ(settings.limits.maxMessageBytes, defaults.maxMessageBytes);
   EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 16777216u);
@@ -73,6 +74,9 @@ idle_exit_seconds = 1.5
 shutdown_grace_seconds = 2
 [log]
 target = "stderr"
+[compression]
+library = "libdeflate"
+level = 9
 )");
   EXPECT_EQ(settings.caFile, "/etc/ca.pem");
   EXPECT_EQ(settings.cellularInterfaces, (std::vector<std::string>{"wwan*", "ppp0"}));
@@ -91,6 +95,7 @@ target = "stderr"
   EXPECT_EQ(settings.limits.idleExitSeconds, 1.5);
   EXPECT_EQ(settings.limits.shutdownGraceSeconds, 2.0);
   EXPECT_EQ(settings.logTarget, LogTarget::standardError);
+  EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::libdeflate, 9}));
 }
 
 TEST(TomlSettings, AHostsTrailingSlashIsDropped) {
@@ -130,6 +135,11 @@ TEST(TomlSettings, WrongTypesAndNumbersOutOfRangeAreErrorsWithTheirLine) {
             std::string::npos);
   EXPECT_EQ(other("[log]\ntarget = \"file\"\n"),
             "k.toml:5: \"log.target\" must be \"auto\", \"journal\" or \"stderr\"");
+  EXPECT_EQ(other("[compression]\nlibrary = \"isal\"\n"),
+            "k.toml:5: \"compression.library\" must be \"zlib\" or \"libdeflate\"");
+  for (const char* level : {"0", "10", "-1", "5.0", "\"5\""})
+    EXPECT_EQ(other(std::string("[compression]\nlevel = ") + level + "\n"),
+              "k.toml:5: \"compression.level\" must be a whole number from 1 to 9");
   EXPECT_EQ(other("[tls]\nca_file = \"ca.pem\"\n"),
             "k.toml:5: \"tls.ca_file\" must be the absolute path of a file");
   EXPECT_EQ(other("[network]\ncellular_interfaces = \"wwan0\"\n"),
