@@ -138,8 +138,9 @@ DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress&
   const unsigned before = progress.calls;
   const Step handled = handleBytes(bytes, consumed, progress);
   const Step kept = keepRest(bytes.subspan(consumed));
-  if (handled != Step::more) return handled;
+  if (handled == Step::broken || handled == Step::stopped) return handled;
   if (kept != Step::more) return kept;
+  if (handled != Step::more) return handled;
   const bool leftWhole = !kept_.empty() && kept_.size() >= needed_;
   // A client that sent many calls has mostly sent more meanwhile: looking costs less than being told.
   const bool mayHaveMore = after == Step::drained && progress.calls - before >= kManyCalls;

@@ -632,6 +632,22 @@ TEST_F(DBusConnectionTest, InvalidatingRightAfterFinishingWaitsForNothing) {
   EXPECT_TRUE(pipe_->closed);
 }
 
+// Its rest would be missing where the client is read again.
+TEST_F(DBusConnectionTest, EndsWhereAPausedClientsRestFindsNoRoom) {
+  shakeHands();
+  pipe_->room = 0;
+  session_->onDisplayURL = [](StringReply reply) { reply(std::string(1000, 'x')); };
+  const auto account = budget_.account(1000);
+  const uint64_t room = limits_.maxQueuedBytes + Limits::socketBytes + 20000;
+  account->takeAnyway(Share::bytes, account->most(Share::bytes) - account->holds(Share::bytes) - room);
+  say(displayURLCalls(500));
+  executor_.runAll();
+  EXPECT_EQ(counters_.value(Reason::queuedBytesExceeded), 1u);
+  EXPECT_EQ(counters_.value(Reason::userBytesExceeded), 1u);
+  EXPECT_EQ(invalidations_, 1);
+  EXPECT_EQ(interruptions_, 1);
+}
+
 TEST(DBusServerInMemory, FreesConnectionsThatAreThereWhenItGoes) {
   const Limits limits;
   UserBudget budget{UserShares::of(limits, uint64_t{1} << 30, 65536)};
