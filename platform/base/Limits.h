@@ -54,8 +54,9 @@ struct Limits {
   static constexpr size_t maxWorkers = 512;                    // threads
   static constexpr size_t maxWorkersPerUser = maxWorkers / 2;  // blocked ones of one user leave others some
   static constexpr size_t maxHandshakeBytes = 16384;           // before authentication
-  static constexpr double handshakeSeconds = 30;
-  static constexpr double messageSeconds = 30;  // once begun; it keeps memory and descriptors until its end
+  static constexpr std::chrono::seconds handshakeTime{30};
+  static constexpr std::chrono::seconds messageTime{
+      30};  // once begun; it keeps memory and descriptors until its end
   static constexpr size_t maxDescriptorsPerMessage = 16;
   // What a connection and its session count, before they hold anything.
   static constexpr size_t connectionBytes = 32768;

@@ -12,7 +12,7 @@ constexpr size_t kMostHeldBytes = 65536;  // a turn's replies beyond that do not
 }  // namespace
 
 ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
-  Event event = Event::none;
+  News news;
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return Sent::closed;
@@ -28,50 +28,48 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
       countWaiting();
       return Sent::queueFull;
     }
-    event = queued(kind);
+    news = queued(kind);
   }
-  tell(event);
+  tell(news);
   return Sent::yes;
 }
 
 void ConnectionOutput::sendHandshake(std::string_view bytes) {
-  Event event = Event::none;
+  News news;
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return;
     pending_.append(bytes);
-    event = queued();
+    news = queued();
   }
-  tell(event);
+  tell(news);
 }
 
 void ConnectionOutput::open() {
-  Event event = Event::none;
+  News news;
   {
     MutexLock lock(mutex_);
     open_ = true;
     if (stream_ == nullptr || dead_ || early_.empty()) return;
     pending_.append(std::exchange(early_, std::string()));
-    event = queued();
+    news = queued();
   }
-  tell(event);
+  tell(news);
 }
 
-ConnectionOutput::Event ConnectionOutput::queued(Kind kind) {
-  Event event = Event::none;
+ConnectionOutput::News ConnectionOutput::queued(Kind kind) {
+  News news;
   const bool mayHold = held_ && waitingBytes() < kMostHeldBytes && waitingBytes() <= maxQueuedBytes_;
-  if (!waiting_ && !mayHold) event = flush();
+  if (!waiting_ && !mayHold) news = flush();
   const size_t left = waitingBytes();
   countWaiting();
-  const bool mayEnd = event != Event::broken && kind != Kind::vital;
+  const bool mayEnd = !news.broken && kind != Kind::vital;
   if (mayEnd && (left > 2 * maxQueuedBytes_ || fillsItsUsersShare())) {
     discard();
-    return Event::overflowed;
+    return {.overflowed = true};
   }
-  if (event == Event::broken || left <= maxQueuedBytes_) return event;
-  if (paused_) return event;
-  paused_ = true;
-  return event == Event::needsRoom ? Event::pausedAndNeedsRoom : Event::paused;
+  news.paused = !news.broken && left > maxQueuedBytes_ && !paused_.exchange(true);
+  return news;
 }
 
 // While the socket takes what is written, little waits, and not for long: that is counted with the connection.
@@ -87,7 +85,7 @@ void ConnectionOutput::discard() {
   charge_.clear();
 }
 
-ConnectionOutput::Event ConnectionOutput::flush() {
+ConnectionOutput::News ConnectionOutput::flush() {
   while (written_ < pending_.size()) {
     const StreamResult result = stream_->write(std::string_view(pending_).substr(written_));
     if (result.status == StreamStatus::wouldBlock) {
@@ -99,11 +97,11 @@ ConnectionOutput::Event ConnectionOutput::flush() {
       if (mayGoOn) paused_ = false;
       waiting_ = true;
       countWaiting();
-      return mayGoOn ? Event::drainedAndNeedsRoom : Event::needsRoom;
+      return {.drained = mayGoOn, .needsRoom = true};
     }
     if (result.status != StreamStatus::ok) {
       discard();
-      return Event::broken;
+      return {.broken = true};
     }
     written_ += result.bytes;
   }
@@ -112,40 +110,18 @@ ConnectionOutput::Event ConnectionOutput::flush() {
   const bool tellDrained = paused_.exchange(false) || (finishing_ && waiting_);
   waiting_ = false;
   countWaiting();
-  return tellDrained ? Event::drained : Event::none;
+  return {.drained = tellDrained};
 }
 
-void ConnectionOutput::tell(Event event) {
-  if (event == Event::none) return;
+void ConnectionOutput::tell(const News& news) {
+  if (!(news.overflowed || news.broken || news.paused || news.drained || news.needsRoom)) return;
   const std::shared_ptr<Observer> observer = observer_.lock();
   if (!observer) return;
-  switch (event) {
-    case Event::none:
-      break;
-    case Event::needsRoom:
-      observer->outputNeedsRoom();
-      break;
-    case Event::pausedAndNeedsRoom:
-      observer->outputPaused();
-      observer->outputNeedsRoom();
-      break;
-    case Event::paused:
-      observer->outputPaused();
-      break;
-    case Event::drainedAndNeedsRoom:
-      observer->outputDrained();
-      observer->outputNeedsRoom();
-      break;
-    case Event::drained:
-      observer->outputDrained();
-      break;
-    case Event::overflowed:
-      observer->outputOverflowed();
-      break;
-    case Event::broken:
-      observer->outputBroken();
-      break;
-  }
+  if (news.overflowed) observer->outputOverflowed();
+  if (news.broken) observer->outputBroken();
+  if (news.paused) observer->outputPaused();
+  if (news.drained) observer->outputDrained();
+  if (news.needsRoom) observer->outputNeedsRoom();
 }
 
 void ConnectionOutput::hold() {
@@ -154,35 +130,35 @@ void ConnectionOutput::hold() {
 }
 
 void ConnectionOutput::release() {
-  Event event = Event::none;
+  News news;
   {
     MutexLock lock(mutex_);
     held_ = false;
-    if (stream_ != nullptr && !dead_ && !waiting_) event = flush();
+    if (stream_ != nullptr && !dead_ && !waiting_) news = flush();
   }
-  tell(event);
+  tell(news);
 }
 
 void ConnectionOutput::writable() {
-  Event event = Event::none;
+  News news;
   {
     MutexLock lock(mutex_);
-    if (stream_ != nullptr && !dead_ && waiting_) event = flush();
+    if (stream_ != nullptr && !dead_ && waiting_) news = flush();
   }
-  tell(event);
+  tell(news);
 }
 
 bool ConnectionOutput::finish() {
-  Event event = Event::none;
+  News news;
   bool written = false;
   {
     MutexLock lock(mutex_);
     finishing_ = true;
     held_ = false;
-    if (stream_ != nullptr && !dead_ && !waiting_) event = flush();
+    if (stream_ != nullptr && !dead_ && !waiting_) news = flush();
     written = stream_ == nullptr || dead_ || pending_.empty();
   }
-  if (!written) tell(event);
+  if (!written) tell(news);
   return written;
 }
 

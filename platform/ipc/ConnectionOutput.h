@@ -35,13 +35,13 @@ class ConnectionOutput {
   };
 
   // `stream` is used until close().
-  ConnectionOutput(Stream& stream, std::weak_ptr<Observer> observer, uint64_t maxQueuedBytes,
-                   const std::shared_ptr<UserAccount>& account)
+  ConnectionOutput(Stream& stream, uint64_t maxQueuedBytes, const std::shared_ptr<UserAccount>& account)
       : stream_(&stream),
-        observer_(std::move(observer)),
         maxQueuedBytes_(maxQueuedBytes),
         account_(account),
         charge_(account, Share::bytes) {}
+  // Once, before anything is sent.
+  void setObserver(std::weak_ptr<Observer> observer) { observer_ = std::move(observer); }
 
   enum class Kind : uint8_t {
     ordinary,
@@ -74,18 +74,16 @@ class ConnectionOutput {
   void close();
 
  private:
-  enum class Event : uint8_t {
-    none,
-    needsRoom,
-    paused,
-    pausedAndNeedsRoom,
-    drained,
-    drainedAndNeedsRoom,
-    overflowed,
-    broken
+  // What the observer is to be told once the mutex is free, in this order. What breaks off stands alone.
+  struct News {
+    bool overflowed = false;
+    bool broken = false;
+    bool paused = false;
+    bool drained = false;
+    bool needsRoom = false;
   };
-  Event flush() REQUIRES(mutex_);
-  Event queued(Kind kind = Kind::ordinary) REQUIRES(mutex_);
+  News flush() REQUIRES(mutex_);
+  News queued(Kind kind = Kind::ordinary) REQUIRES(mutex_);
   [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) {
     return pending_.size() - written_ + early_.size();
   }
@@ -94,11 +92,11 @@ class ConnectionOutput {
     return waiting_ && account_ != nullptr && account_->isOver(Share::bytes);
   }
   void discard() REQUIRES(mutex_);
-  void tell(Event event);
+  void tell(const News& news);
 
   mutable Mutex mutex_;
   Stream* stream_ GUARDED_BY(mutex_);
-  const std::weak_ptr<Observer> observer_;
+  std::weak_ptr<Observer> observer_;  // constant once anything is sent
   const uint64_t maxQueuedBytes_;
   const std::shared_ptr<UserAccount> account_;
   Charge charge_ GUARDED_BY(mutex_);  // for what waits while the socket is full, its own buffer included

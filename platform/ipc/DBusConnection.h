@@ -6,8 +6,8 @@
 // milliseconds and stands in line again. What follows the last whole message is kept until more comes; an idle connection
 // keeps nothing.
 //
-// The end has one road: the session's handlers run, what waits is written, the watch ends, the descriptor is
-// closed, the table forgets the connection.
+// Its life goes one way (ConnectionLife), and the end has one road: the session's handlers run, what waits is written, the
+// watch ends, the descriptor is closed, the table forgets the connection.
 #pragma once
 
 #include <atomic>
@@ -18,33 +18,36 @@
 #include <string>
 #include <vector>
 
-#include "platform/Reactor.h"
 #include "platform/base/Counters.h"
-#include "platform/base/Mutex.h"
 #include "platform/base/UserBudget.h"
+#include "platform/ipc/Admission.h"
+#include "platform/ipc/ConnectionLife.h"
 #include "platform/ipc/ConnectionOutput.h"
 #include "platform/ipc/Handshake.h"
+#include "platform/ipc/KeptBytes.h"
 #include "platform/ipc/Listener.h"
 #include "platform/ipc/MessageReader.h"
+#include "platform/ipc/Patience.h"
+#include "platform/ipc/ReceivedDescriptors.h"
+#include "platform/ipc/RemoteClient.h"
 #include "platform/ipc/ServerContext.h"
+#include "platform/ipc/SocketWatch.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/Timer.h"
 
 namespace kyt {
 
 class DBusConnection final : public Connection,
-                             private ClientSessionReplyInterface,
                              private ConnectionOutput::Observer,
                              public std::enable_shared_from_this<DBusConnection> {
  public:
   DBusConnection(std::shared_ptr<ServerContext> context, std::unique_ptr<Stream> stream, PeerCredentials peer,
                  std::shared_ptr<UserAccount> account, uint64_t number);
-  ~DBusConnection() override;
 
-  // Asks the delegate, on the queue; starts, or closes at once.
+  // Enters the server's table, and asks the delegate, on the queue; starts, or closes at once. Called once, first.
   void offer(Listener& listener, ListenerDelegate& delegate);
-  // The server is going: no handler runs any more, nothing is written.
-  void abandon();
+  // The server is going: no handler runs any more, nothing is written. False when it was closed already.
+  bool abandon();
 
   [[nodiscard]] Value entitlementValue(std::string_view key) override;
   [[nodiscard]] std::string description() const override;
@@ -56,7 +59,7 @@ class DBusConnection final : public Connection,
   void resume() override;
   void invalidate() override;
   void finish() override;
-  [[nodiscard]] ClientSessionReplyInterface& remoteObjectProxy() override { return *this; }
+  [[nodiscard]] ClientSessionReplyInterface& remoteObjectProxy() override { return client_; }
   [[nodiscard]] const std::shared_ptr<SerialQueue>& queue() const override { return queue_; }
 
  private:
@@ -75,11 +78,11 @@ class DBusConnection final : public Connection,
     size_t bytes = 0;
     bool over = false;  // the turn has had its share
     HeaderMemory header;
+    void countCall(const Clock& clock);
   };
 
   // Those that require the queue are its work, or steps of it.
   void turn() REQUIRES(*queue_);
-  void countCall(Progress& progress) const;
   Step runSteps(Progress& progress) REQUIRES(*queue_);
   Step step(std::span<std::byte> buffer, Progress& progress) REQUIRES(*queue_);
   Step readMore(std::span<std::byte> buffer, size_t& bytes) REQUIRES(*queue_);
@@ -87,24 +90,18 @@ class DBusConnection final : public Connection,
   Step handleHandshake(std::span<const std::byte> bytes, size_t& consumed) REQUIRES(*queue_);
   Step handleMessage(std::span<const std::byte> bytes, size_t& consumed, HeaderMemory& header)
       REQUIRES(*queue_);
-  Step takeDescriptors(const Message& message, std::vector<Descriptor>& taken) REQUIRES(*queue_);
   [[nodiscard]] bool mustPause() const;
-  Step keepRest(std::span<const std::byte> rest) REQUIRES(*queue_);
-  Step tooManyBytes() REQUIRES(*queue_);
   void watchBegunMessage() REQUIRES(*queue_);
   void messageTookTooLong() REQUIRES(*queue_);
   Step breakOff(Reason reason, const char* problem) REQUIRES(*queue_);
-  [[nodiscard]] std::string descriptionOnQueue() const REQUIRES(*queue_);
 
-  void countRefusal() REQUIRES(*queue_);
+  void decide(Listener& listener, ListenerDelegate& delegate) REQUIRES(*queue_);
   void start() REQUIRES(*queue_);
   void handshakeTookTooLong() REQUIRES(*queue_);
-  void end(bool broken, bool waitForOutput) REQUIRES(*queue_);
-  void endLater(bool broken);
+  void end(Step how) REQUIRES(*queue_);
+  void endLater(Step how);
   void closeStream() REQUIRES(*queue_);
-  [[nodiscard]] bool closed() const { return closed_; }
   void scheduleTurn();
-  void armRead();
   void armWatch(unsigned events);
   void handleReady(unsigned events);
 
@@ -114,56 +111,32 @@ class DBusConnection final : public Connection,
   void outputOverflowed() override;
   void outputBroken() override;
 
-  [[nodiscard]] std::optional<Error> sendMessageToClient(std::optional<Dictionary> sessionInfo,
-                                                         double timestamp, uint16_t category, uint16_t type,
-                                                         std::optional<Dictionary> payload) override;
-
   // Constant.
   const std::shared_ptr<ServerContext> context_;
   const uint64_t number_;
   const uint32_t user_;
   const int32_t process_;
-  const int descriptor_;  // the stream's
   const std::shared_ptr<UserAccount> account_;
   const std::shared_ptr<SerialQueue> queue_;
+  const std::shared_ptr<ConnectionOutput> output_;
 
   // Synchronises itself.
-  std::shared_ptr<ConnectionOutput> output_;
-  std::atomic<bool> invalidating_{false};  // stop handling calls
-  std::atomic<bool> finishing_{false};     // stop reading
-  std::atomic<bool> hurried_{false};       // do not wait for what is queued to be written
-  std::atomic<bool> peerGone_{false};      // the reactor saw the end of the client's side
+  ConnectionLife life_;
+  RemoteClient client_;
+  SocketWatch watch_;
+  // Nobody waits for what is queued to be written: the connection was invalidated, or the client has ended its side.
+  std::atomic<bool> hurried_{false};
   std::atomic<bool> turnScheduled_{false};
 
-  // Until it is resumed, who the client is.
-  std::unique_ptr<PeerCredentials> peer_ GUARDED_BY(*queue_);
+  std::unique_ptr<Admission> admission_ GUARDED_BY(*queue_);  // until the delegate has decided
   std::unique_ptr<Stream> stream_ GUARDED_BY(*queue_);
-  std::unique_ptr<ServerHandshake> handshake_ GUARDED_BY(*queue_);
+  std::unique_ptr<ServerHandshake> handshake_ GUARDED_BY(*queue_);  // until it is done
   TimerHandle handshakeTimer_ GUARDED_BY(*queue_);
   std::shared_ptr<ClientSessionInterface> exportedObject_ GUARDED_BY(*queue_);
   Task interruptionHandler_ GUARDED_BY(*queue_), invalidationHandler_ GUARDED_BY(*queue_);
-  // The beginning of a message, or messages that the last turn left; and how much it must hold before it is worth
-  // looking at.
-  std::string kept_ GUARDED_BY(*queue_);
-  size_t needed_ GUARDED_BY(*queue_) = 0;
-  std::vector<Descriptor> descriptors_ GUARDED_BY(*queue_);
-  Charge keptCharge_ GUARDED_BY(*queue_), descriptorsCharge_ GUARDED_BY(*queue_);  // for these
-  // While a message is unfinished, and a little longer.
-  TimerHandle messageTimer_ GUARDED_BY(*queue_);
-  bool messageTimed_ GUARDED_BY(*queue_) = false;
-  // Handled by now, and when the timer was set.
-  uint64_t messages_ GUARDED_BY(*queue_) = 0, timedMessages_ GUARDED_BY(*queue_) = 0;
-  bool descriptorsAgreed_ GUARDED_BY(*queue_) = false;
-  bool refused_ GUARDED_BY(*queue_) = false;  // what was asked for was not granted
-  bool resumed_ GUARDED_BY(*queue_) = false, started_ GUARDED_BY(*queue_) = false;
-  bool ended_ GUARDED_BY(*queue_) = false;
-
-  // The queue, the reactor's thread and writers arm the watch. The mutex is held over the system call; the handler does
-  // without it, since what was armed may be ready at once.
-  Mutex watchMutex_;
-  Watch watch_ GUARDED_BY(watchMutex_);
-  std::atomic<unsigned> armed_{0};
-  std::atomic<bool> closed_{false};  // set under the mutex
+  KeptBytes kept_ GUARDED_BY(*queue_);
+  ReceivedDescriptors descriptors_ GUARDED_BY(*queue_);
+  Patience patience_ GUARDED_BY(*queue_);
 };
 
 }  // namespace kyt

@@ -154,7 +154,6 @@ class DBusServer::Acceptance : public std::enable_shared_from_this<Acceptance> {
     const uint64_t number = ++lastNumber_;
     const auto connection = std::make_shared<DBusConnection>(context_, std::move(stream), std::move(peer),
                                                              std::move(account), number);
-    context_->enlist(number, connection);
     connection->offer(listener_, *delegate_);
   }
 
