@@ -30,6 +30,7 @@
 #include "platform/base/Mutex.h"
 #include "platform/ipc/Listener.h"
 #include "platform/objects/Value.h"
+#include "platform/queues/Monitor.h"
 #include "session/ReportingdSessionDelegate.h"
 
 namespace kyt {

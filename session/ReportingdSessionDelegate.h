@@ -7,8 +7,8 @@
 #include <string>
 
 #include "backend/SessionIDPath.h"
-#include "platform/base/Mutex.h"
 #include "platform/objects/Value.h"
+#include "platform/queues/Monitor.h"
 
 namespace kyt {
 

@@ -1,9 +1,8 @@
 // The locks of this project, annotated so that clang's thread-safety analysis can check every guarded field. Serial queues
 // (platform/queues/SerialQueue.h) are annotated with the same macros.
 //
-// `Mutex` is for the few private, short critical sections. `Monitor` is the recursive lock of an object (the agent): a
-// thread that holds it may call operations that take it again. Any thread may use both; neither makes a system call
-// without contention. docs/THREADS.md has the order of locks.
+// `Mutex` is for the few private, short critical sections; any thread, no system call without contention. What many wait
+// for, or for long, is a Monitor or a Gate (platform/queues/). docs/THREADS.md has the order of locks.
 #pragma once
 
 #include <mutex>
@@ -53,32 +52,6 @@ class SCOPED_CAPABILITY MutexLock {
 
  private:
   Mutex& mutex_;
-};
-
-// A recursive lock that announces a contended wait to the worker pool (a storebag download may hold the agent's
-// monitor for seconds; the pool keeps other sessions running meanwhile). lock() is defined in WorkerPool.cpp.
-class CAPABILITY("monitor") Monitor {
- public:
-  Monitor() = default;
-  Monitor(const Monitor&) = delete;
-  Monitor& operator=(const Monitor&) = delete;
-  void lock() ACQUIRE();
-  void unlock() RELEASE() { mutex_.unlock(); }
-  [[nodiscard]] bool tryLock() TRY_ACQUIRE(true) { return mutex_.try_lock(); }
-
- private:
-  std::recursive_mutex mutex_;
-};
-
-class SCOPED_CAPABILITY MonitorLock {
- public:
-  explicit MonitorLock(Monitor& monitor) ACQUIRE(monitor) : monitor_(monitor) { monitor_.lock(); }
-  ~MonitorLock() RELEASE() { monitor_.unlock(); }
-  MonitorLock(const MonitorLock&) = delete;
-  MonitorLock& operator=(const MonitorLock&) = delete;
-
- private:
-  Monitor& monitor_;
 };
 
 }  // namespace kyt

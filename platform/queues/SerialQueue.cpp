@@ -25,6 +25,7 @@ constexpr unsigned kMostRunsAtEnd = 256;  // of queues at the end of one turn; t
 
 thread_local char identity;  // its address tells threads apart
 thread_local Turn* currentTurn = nullptr;
+thread_local uint64_t currentOwner = 0;
 
 }  // namespace
 
@@ -261,9 +262,15 @@ void SerialQueue::grant() {
   granted.notify_one();  // uses the address alone: the waiter may be gone
 }
 
+uint64_t SerialQueue::ownerOfThread() noexcept {
+  return currentOwner;
+}
+
 void SerialQueue::runPending() {
   if (!takePending(true)) return;
+  const uint64_t outer = owner_ == 0 ? currentOwner : std::exchange(currentOwner, owner_);
   runReady(kFairShare);
+  currentOwner = outer;
   leaveWithWork(false);
 }
 

@@ -34,8 +34,7 @@ namespace kyt {
 class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<SerialQueue> {
  public:
   // `label` must outlive the queue (a literal). `owner` groups queues of one user for the pool's fairness:
-  // the pool lets the queues of one owner hold at most half of its workers (0: the daemon itself, not
-  // limited).
+  // the pool limits the workers that the queues of one owner hold (0: the daemon itself, not limited).
   static std::shared_ptr<SerialQueue> create(const char* label, Executor& executor, uint64_t owner = 0);
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
@@ -62,6 +61,10 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
   [[nodiscard]] const char* label() const noexcept { return label_; }
   [[nodiscard]] uint64_t owner() const noexcept { return owner_; }
   [[nodiscard]] Executor& executor() const noexcept { return executor_; }
+
+  // The owner of the queue that the calling thread runs for an executor, or 0; queues of the daemon itself that it runs
+  // meanwhile do not count.
+  [[nodiscard]] static uint64_t ownerOfThread() noexcept;
 
   // For executors. Runs what is pending when it begins, at most `kFairShare` pieces; what is left or came
   // meanwhile is submitted again, so that queues take turns. Returns at once when another thread is running

@@ -15,7 +15,6 @@
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Mutex.h"
-#include "platform/base/SpinPause.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/OwnerLines.h"
 #include "platform/queues/SerialQueue.h"
@@ -25,6 +24,7 @@ namespace kyt {
 namespace {
 
 constexpr Duration kRefusedPause = std::chrono::milliseconds(10);
+constexpr size_t kLeftForOneInLine = 4;  // workers that are left, for each of one owner's that stands in line
 
 }  // namespace
 
@@ -37,11 +37,12 @@ struct WorkerPool::Worker final : BlockingObserver {
   // Guarded by the pool's mutex.
   bool alive = false;
   bool woken = false;
-  uint64_t owner = 0;  // of the queue it runs
+  uint64_t owner = 0;   // of the queue it runs
+  bool inLine = false;  // for a lock that others' queues hold
   // Its own thread's.
   const SerialQueue* queue = nullptr;  // what it runs
 
-  void willBlock() override;
+  void willBlock(BlockingKind kind) override;
   void hasBlocked() override;
 };
 
@@ -60,8 +61,8 @@ class WorkerPool::Implementation {
   bool shutDown(MonotonicTime end);
   void stopInsisting();
   void tryAgain();
-  void block();
-  void unblock();
+  void block(Worker& self, bool inLine);
+  void unblock(Worker& self);
   [[nodiscard]] bool borrow();
   void giveBack();
   [[nodiscard]] WorkerPoolFigures figures();
@@ -74,6 +75,7 @@ class WorkerPool::Implementation {
   bool hasWorkAfterQuiet() REQUIRES(mutex_);
   std::shared_ptr<SerialQueue> take(Worker& self) REQUIRES(mutex_);
   void release(Worker& self) REQUIRES(mutex_);
+  void unpark(uint64_t owner) REQUIRES(mutex_);
   void countExhausted() REQUIRES(mutex_);
   void tellExhausted();
   [[nodiscard]] bool ownerMayRun(uint64_t owner) REQUIRES(mutex_);
@@ -90,13 +92,15 @@ class WorkerPool::Implementation {
   std::vector<std::unique_ptr<Worker>> slots_ GUARDED_BY(mutex_);
   std::vector<Worker*> idle_ GUARDED_BY(mutex_);  // asleep; the last one is woken first
   OwnerLines ready_ GUARDED_BY(mutex_);
-  std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their half
+  std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their share
+  uint64_t unparked_ GUARDED_BY(mutex_) = 0;              // the owner whose turn it was last
   ConditionVariable allEnded_;
   std::thread ended_ GUARDED_BY(mutex_);  // the last worker that ended; the next to end joins it
   size_t workers_ GUARDED_BY(mutex_) = 0;
   size_t running_ GUARDED_BY(mutex_) = 0;  // neither asleep nor blocked
   size_t looking_ GUARDED_BY(mutex_) = 0;  // … of which about to look for work
   size_t blocked_ GUARDED_BY(mutex_) = 0;
+  size_t inLine_ GUARDED_BY(mutex_) = 0;  // … of which for a lock
   size_t mostWorkers_ GUARDED_BY(mutex_) = 0;
   uint64_t wakeUps_ GUARDED_BY(mutex_) = 0;
   size_t borrowed_ GUARDED_BY(mutex_) = 0;  // queues that threads of others run
@@ -230,8 +234,8 @@ void WorkerPool::Implementation::work(Worker& self) {
     self.queue = nullptr;
     queue.reset();
     mutex_.lock();
-    release(self);
     ++looking_;
+    release(self);
   }
   self.alive = false;
   if (--workers_ == 0) allEnded_.notifyAll();
@@ -283,19 +287,38 @@ std::shared_ptr<SerialQueue> WorkerPool::Implementation::take(Worker& self) {
   return nullptr;
 }
 
+// Of the workers that are left an owner may hold as many again as it holds, up to its half; and it may have a quarter as
+// many in line for a lock. So however many owners hold what they may, the next one finds workers. Who holds none may run:
+// the worker that asks is one of those that are left.
 bool WorkerPool::Implementation::ownerMayRun(uint64_t owner) {
-  if (owner == 0 || running_ + blocked_ - looking_ < mostOfOneOwner_) return true;
-  const auto held = std::count_if(slots_.begin(), slots_.end(),
-                                  [owner](const auto& slot) { return slot->alive && slot->owner == owner; });
-  return static_cast<size_t>(held) < mostOfOneOwner_;
+  const size_t used = running_ + blocked_ - looking_, left = options_.maxWorkers - used;
+  if (owner == 0) return true;
+  if (used < std::min(mostOfOneOwner_, left) && inLine_ * kLeftForOneInLine < left) return true;
+  size_t held = 0, inLine = 0;
+  for (const auto& slot : slots_) {
+    if (!slot->alive || slot->owner != owner) continue;
+    ++held;
+    if (slot->inLine) ++inLine;
+  }
+  return held < std::min(mostOfOneOwner_, left) && (inLine == 0 || inLine * kLeftForOneInLine < left);
 }
 
-// The worker has run its queue. One that waited for a worker of this owner is next in line again.
+// The worker has run its queue. What waited for a worker of this owner is next in line again; and what another owner's
+// shares kept back, in turns, since there is a worker more now.
 void WorkerPool::Implementation::release(Worker& self) {
   const uint64_t owner = std::exchange(self.owner, 0);
-  if (owner == 0 || parked_.empty()) return;
+  if (parked_.empty()) return;
+  unpark(owner);
+  auto next = parked_.upper_bound(unparked_);
+  if (next == parked_.end()) next = parked_.begin();
+  if (next == parked_.end() || next->first == owner) return;
+  unparked_ = next->first;
+  unpark(unparked_);
+}
+
+void WorkerPool::Implementation::unpark(uint64_t owner) {
   const auto found = parked_.find(owner);
-  if (found == parked_.end()) return;
+  if (found == parked_.end() || !ownerMayRun(owner)) return;
   ready_.pushFirst(std::move(found->second.front()));
   found->second.pop_front();
   if (found->second.empty()) parked_.erase(found);
@@ -312,21 +335,24 @@ void WorkerPool::Implementation::tellExhausted() {
     options_.log->normal("WorkerPool(work): work waits, as many workers as may be are in use");
 }
 
-void WorkerPool::Implementation::block() {
+void WorkerPool::Implementation::block(Worker& self, bool inLine) {
   Worker* toWake;
   {
     MutexLock lock(mutex_);
     --running_;
     ++blocked_;
+    self.inLine = inLine;
+    if (inLine) ++inLine_;
     toWake = workerToWake();
   }
   if (toWake != nullptr) toWake->wake.notifyOne();
 }
 
-void WorkerPool::Implementation::unblock() {
+void WorkerPool::Implementation::unblock(Worker& self) {
   MutexLock lock(mutex_);
   --blocked_;
   ++running_;
+  if (std::exchange(self.inLine, false)) --inLine_;
 }
 
 bool WorkerPool::Implementation::borrow() {
@@ -417,11 +443,11 @@ WorkerPoolFigures WorkerPool::figures() const {
   return implementation_->figures();
 }
 
-void WorkerPool::Worker::willBlock() {
-  pool->block();
+void WorkerPool::Worker::willBlock(BlockingKind kind) {
+  pool->block(*this, kind == BlockingKind::inLine);
 }
 void WorkerPool::Worker::hasBlocked() {
-  pool->unblock();
+  pool->unblock(*this);
 }
 
 namespace {
@@ -434,22 +460,13 @@ BlockingObserver* BlockingObserver::exchange(BlockingObserver* observer) noexcep
   return std::exchange(blockingObserver, observer);
 }
 
-BlockingScope::BlockingScope() : observer_(blockingObserver) {
+BlockingScope::BlockingScope(BlockingKind kind) : observer_(blockingObserver) {
   if (Turn* turn = Turn::current()) turn->handDeferredToExecutors();
-  if (observer_ != nullptr && observer_->depth_++ == 0) observer_->willBlock();
+  if (observer_ != nullptr && observer_->depth_++ == 0) observer_->willBlock(kind);
 }
 
 BlockingScope::~BlockingScope() {
   if (observer_ != nullptr && --observer_->depth_ == 0) observer_->hasBlocked();
-}
-
-void Monitor::lock() {
-  for (int spin = 0; spin < 40; ++spin) {  // most holders are done within a microsecond
-    if (mutex_.try_lock()) return;
-    spinPause();
-  }
-  BlockingScope blocking;
-  mutex_.lock();
 }
 
 }  // namespace kyt

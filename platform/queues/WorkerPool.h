@@ -2,8 +2,9 @@
 //
 // Several operations block by design (a storebag download, uploads, the wait for the agent's monitor while it
 // is held by a download). A worker announces that with a BlockingScope, and the pool then keeps enough others
-// running. At most `Limits::maxWorkers` threads exist; the queues of one owner occupy at most half of them;
-// work past that waits, counted. Idle workers end after a while, the last one too, so an idle daemon has no
+// running. At most `Limits::maxWorkers` threads exist. The queues of one owner occupy at most half of those that others
+// do not, and those that stand in line for a lock at most a quarter as many as are left, so that several owners together
+// leave some to the next; work past that waits, counted. Idle workers end after a while, the last one too, so an idle daemon has no
 // wake-ups.
 //
 // The queues of one owner run in the order of their submission, and the owners take turns: whoever has made many queues
@@ -67,12 +68,15 @@ class WorkerPool final : public Executor {
   std::unique_ptr<Implementation> implementation_;
 };
 
+// What a thread waits for: others that hold a lock, or anything else.
+enum class BlockingKind : uint8_t { inLine, other };
+
 // Who is told when its thread is about to wait: a worker, so that its pool keeps others running, and the
 // reactor, so that another thread goes on waiting for events. Nested waits are told once.
 class BlockingObserver {
  public:
   virtual ~BlockingObserver() = default;
-  virtual void willBlock() = 0;
+  virtual void willBlock(BlockingKind kind) = 0;
   virtual void hasBlocked() = 0;
   // Of the calling thread; null: none. Returns the former one.
   static BlockingObserver* exchange(BlockingObserver* observer) noexcept;
@@ -86,7 +90,7 @@ class BlockingObserver {
 // observer. Before it waits, whatever this thread's turn deferred is handed to the executors.
 class BlockingScope {
  public:
-  BlockingScope();
+  explicit BlockingScope(BlockingKind kind = BlockingKind::other);
   ~BlockingScope();
   BlockingScope(const BlockingScope&) = delete;
   BlockingScope& operator=(const BlockingScope&) = delete;

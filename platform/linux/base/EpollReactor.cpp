@@ -77,7 +77,7 @@ class AsideRun final : public BlockingObserver {
   [[nodiscard]] bool hasNext() const { return next_ < queues_.size() && queues_[next_] != nullptr; }
 
  private:
-  void willBlock() override {
+  void willBlock(BlockingKind) override {
     submitRest();
     threads_.giveLeadAway(number_);
   }

@@ -33,7 +33,7 @@ int raiseLimit(int wanted) {
 
 class Observer final : public BlockingObserver {
  public:
-  void willBlock() override { ++waits; }
+  void willBlock(BlockingKind) override { ++waits; }
   void hasBlocked() override {}
   int waits = 0;
 };

@@ -109,7 +109,7 @@ TEST_F(PluginTest, CallsAnObjectsOperationByItsName) {
 
 TEST_F(PluginTest, EachCallIsAnnouncedAsAWait) {
   struct Observer final : BlockingObserver {
-    void willBlock() override { ++waits; }
+    void willBlock(BlockingKind) override { ++waits; }
     void hasBlocked() override { ++ends; }
     int waits = 0, ends = 0;
   } observer;

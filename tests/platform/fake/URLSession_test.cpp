@@ -58,7 +58,7 @@ TEST_F(StartAndWait, ReturnsTheErrorOfARequestThatFailed) {
 class Waiting final : public BlockingObserver {
  public:
   explicit Waiting(Semaphore& begun) : begun_(begun) {}
-  void willBlock() override { begun_.signal(); }
+  void willBlock(BlockingKind) override { begun_.signal(); }
   void hasBlocked() override {}
 
  private:

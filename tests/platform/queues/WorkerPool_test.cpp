@@ -483,45 +483,6 @@ TEST(WorkerPool, DestroysPendingWorkAtShutDownAndFinishesWhatRuns) {
   pool.shutDown();  // again: nothing to do
 }
 
-void takeTwice(Monitor& monitor) NO_THREAD_SAFETY_ANALYSIS {
-  monitor.lock();
-  monitor.lock();
-  monitor.unlock();
-  monitor.unlock();
-}
-
-TEST(Monitor, MayBeTakenAgainByItsHolder) {
-  Monitor monitor;
-  takeTwice(monitor);
-  bool taken = false;
-  std::thread([&] {
-    if (monitor.tryLock()) {
-      taken = true;
-      monitor.unlock();
-    }
-  }).join();
-  EXPECT_TRUE(taken);
-}
-
-TEST(WorkerPool, KeepsOthersRunningWhileAMonitorIsHeld) {
-  WorkerPool pool(options(1));
-  Monitor monitor;
-  auto waiter = SerialQueue::create("waiter", pool);
-  auto other = SerialQueue::create("other", pool);
-  Semaphore waited, ran;
-  {
-    MonitorLock lock(monitor);
-    waiter->async([&] {
-      MonitorLock inner(monitor);
-      waited.signal();
-    });
-    EXPECT_TRUE(eventually([&] { return pool.figures().blocked == 1; }));
-    other->async([&] { ran.signal(); });
-    EXPECT_TRUE(ran.waitFor(kDeadline));
-  }
-  EXPECT_TRUE(waited.waitFor(kDeadline));
-}
-
 // A worker that waits for a queue held by a blocked one announces it, so the pool does not run dry.
 TEST(WorkerPool, KeepsOthersRunningWhileASynchronousCallWaits) {
   WorkerPool pool(options(1));
