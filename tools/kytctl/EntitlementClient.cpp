@@ -83,7 +83,7 @@ std::variant<EntitlementClient, std::string> EntitlementClient::ofUser(const std
   int64_t number = 0;
   const auto parsed = std::from_chars(text.data(), text.data() + text.size(), number);
   const bool isNumber = parsed.ec == std::errc() && parsed.ptr == text.data() + text.size();
-  const auto user = userNumber(isNumber ? NameOrNumber(number) : NameOrNumber(text));
+  const auto user = AccountNumbers().user(isNumber ? NameOrNumber(number) : NameOrNumber(text));
   if (!user) return "there is no user \"" + text + "\"";
   EntitlementClient client;
   client.peer.uid = client.peer.gid = *user;

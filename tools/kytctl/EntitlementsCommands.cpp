@@ -132,18 +132,20 @@ enum class Answer : uint8_t { matches, unknown, differs };  // of several the la
 class Check {
  public:
   Check(const EntitlementClient& client, bool servicesView, ProgramInspector& inspector)
-      : client_(client), servicesView_(servicesView), match_(client.peer, inspector) {}
+      : client_(client), servicesView_(servicesView), match_(client.peer, inspector, numbers_) {}
 
   // Tells each criterion; all of them, so that a second fault is seen before the first is mended.
   Answer grant(const EntitlementGrant& grant) {
     answer_ = Answer::matches;
     if (grant.user)
       tell("user " + text(*grant.user), match_.isUser(*grant.user),
-           userNumber(*grant.user) ? "the client is " + userText(client_.peer.uid) : "there is no such user");
+           numbers_.user(*grant.user) ? "the client is " + userText(client_.peer.uid)
+                                      : "there is no such user");
     if (grant.user) noteDigits("user", *grant.user);
     if (grant.group)
       tell("group " + text(*grant.group), match_.isMember(*grant.group),
-           groupNumber(*grant.group) ? "the client is in " + client_.groupsText() : "there is no such group");
+           numbers_.group(*grant.group) ? "the client is in " + client_.groupsText()
+                                        : "there is no such group");
     if (grant.group) noteDigits("group", *grant.group);
     if (grant.securityLabel) label(*grant.securityLabel);
     if (grant.executable) executable(*grant.executable);
@@ -226,6 +228,7 @@ class Check {
 
   const EntitlementClient& client_;
   const bool servicesView_;
+  AccountNumbers numbers_;
   EntitlementMatch match_;
   Answer answer_ = Answer::matches;
 };

@@ -8,6 +8,7 @@
 #include <variant>
 
 #include "platform/Entitlements.h"
+#include "platform/linux/entitlements/AccountNumbers.h"
 #include "platform/linux/entitlements/EntitlementsFile.h"
 #include "platform/linux/helpers/ProgramInspector.h"
 
@@ -28,9 +29,9 @@ class EntitlementMatch {
     ProgramIdentity wanted, running;  // zeros when not known
   };
 
-  // Both outlive this.
-  EntitlementMatch(const PeerCredentials& peer, ProgramInspector& inspector)
-      : peer_(peer), inspector_(inspector) {}
+  // All outlive this.
+  EntitlementMatch(const PeerCredentials& peer, ProgramInspector& inspector, AccountNumbers& numbers)
+      : peer_(peer), inspector_(inspector), numbers_(numbers) {}
 
   [[nodiscard]] bool isUser(const NameOrNumber& user) const;
   [[nodiscard]] bool isMember(const NameOrNumber& group) const;
@@ -47,12 +48,9 @@ class EntitlementMatch {
  private:
   const PeerCredentials& peer_;
   ProgramInspector& inspector_;
+  AccountNumbers& numbers_;
   std::optional<std::variant<ProgramIdentity, int>> running_;
   std::optional<std::string> lack_;
 };
-
-// The user's or group's number; none when nobody has that name.
-[[nodiscard]] std::optional<uint32_t> userNumber(const NameOrNumber& user);
-[[nodiscard]] std::optional<uint32_t> groupNumber(const NameOrNumber& group);
 
 }  // namespace kyt

@@ -93,7 +93,7 @@ void TomlEntitlements::sayOnce(const std::string& why) {
 
 std::string TomlEntitlements::executableOf(const PeerCredentials& peer) {
   std::string path = inspector_.programPath(peer.pid);
-  return EntitlementMatch(peer, inspector_).isAlive() ? path : std::string();
+  return EntitlementMatch(peer, inspector_, numbers_).isAlive() ? path : std::string();
 }
 
 std::shared_ptr<const std::vector<EntitlementGrant>> TomlEntitlements::currentGrants() {
@@ -105,7 +105,7 @@ std::shared_ptr<const std::vector<EntitlementGrant>> TomlEntitlements::currentGr
 Value TomlEntitlements::valueFor(const PeerCredentials& peer, std::string_view key) {
   const auto grants = currentGrants();
   Value result;
-  EntitlementMatch match(peer, inspector_);
+  EntitlementMatch match(peer, inspector_, numbers_);
   for (const EntitlementGrant& grant : *grants) {
     const auto value = grant.values.find(key);
     if (value == grant.values.end() || !match.matches(grant)) continue;

@@ -3,7 +3,7 @@
 //
 // The files are looked at (a stat each) for every connection and read again when they changed. What the machine cannot
 // read at the moment (no descriptor, no memory) keeps its former grants, is tried again for the next connection, and is
-// logged at most once a minute. What a peer runs, which may take long to learn, is asked with nothing locked.
+// logged at most once a minute; so are users and groups by name (AccountNumbers.h). What a peer runs, which may take long to learn, is asked with nothing locked.
 #pragma once
 
 #include <map>
@@ -19,6 +19,7 @@
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Mutex.h"
+#include "platform/linux/entitlements/AccountNumbers.h"
 #include "platform/linux/entitlements/EntitlementsFile.h"
 #include "platform/linux/files/Files.h"
 #include "platform/linux/helpers/ProgramInspector.h"
@@ -60,6 +61,7 @@ class TomlEntitlements final : public Entitlements {
   Log& log_;
   Counters& counters_;
   const Clock& clock_;
+  AccountNumbers numbers_;  // synchronises itself
   Mutex mutex_;
   bool certain_ GUARDED_BY(mutex_) = false;  // what was read holds as long as the identities do
   bool saidNoInspection_ GUARDED_BY(mutex_) = false;

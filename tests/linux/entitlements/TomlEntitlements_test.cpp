@@ -478,6 +478,24 @@ TEST_F(TomlEntitlementsTest, WhatCannotBeOpenedForAMomentKeepsItsGrants) {
   }
 }
 
+TEST_F(TomlEntitlementsTest, ANameThatCannotBeLookedUpForAMomentStandsForItsLastNumber) {
+  grant("user = \"root\"\n");
+  grant("group = \"root\"\n", "b.toml");
+  EXPECT_TRUE(entitlements_.valueFor(peer(0), "com.vantu.other").isNull()) << "reads the files";
+  {
+    const NoDescriptors none;
+    EXPECT_FALSE(isGranted(peer(0, 77))) << "nobody has looked up the name yet";
+  }
+  ASSERT_TRUE(isGranted(peer(0, 77)));
+  ASSERT_TRUE(isGranted(peer(77, 0)));
+  for (int i = 0; i < 3; ++i) {
+    const NoDescriptors none;
+    EXPECT_TRUE(isGranted(peer(0, 77)));
+    EXPECT_TRUE(isGranted(peer(77, 0)));
+    EXPECT_FALSE(isGranted(peer(77, 77)));
+  }
+}
+
 TEST_F(TomlEntitlementsTest, WhatCouldNotBeOpenedAtFirstIsReadWithoutAChange) {
   grant("user = 1234\n");
   // Old enough for its times to tell every change.
