@@ -1,6 +1,6 @@
 #include "daemon/HierarchyGroup.h"
 
-#include <limits>
+#include <utility>
 
 #include "session/ReportingdSession.h"
 
@@ -12,6 +12,7 @@ uint64_t HierarchyGroup::append(Session session) {
   const uint32_t level = session->hierarchyLevel();
   byLevel_[{level, place}] = session.get();
   inOrder_[place] = Member{std::move(session), level};
+  lookForAggregator(level);
   return place;
 }
 
@@ -19,8 +20,10 @@ void HierarchyGroup::remove(uint64_t place) {
   const auto member = inOrder_.find(place);
   if (member == inOrder_.end()) return;
   runs_.reset();
-  byLevel_.erase({member->second.level, place});
+  const uint32_t level = member->second.level;
+  byLevel_.erase({level, place});
   inOrder_.erase(member);
+  lookForAggregator(level);
 }
 
 void HierarchyGroup::relevel(uint64_t place) {
@@ -28,9 +31,24 @@ void HierarchyGroup::relevel(uint64_t place) {
   if (member == inOrder_.end()) return;
   runs_.reset();
   ReportingdSession* session = member->second.session.get();
-  byLevel_.erase({member->second.level, place});
-  member->second.level = session->hierarchyLevel();
+  const uint32_t former = std::exchange(member->second.level, session->hierarchyLevel());
+  byLevel_.erase({former, place});
   byLevel_[{member->second.level, place}] = session;
+  lookForAggregator(former);
+  lookForAggregator(member->second.level);
+}
+
+void HierarchyGroup::aggregationMayHaveChanged(uint64_t place) {
+  const auto member = inOrder_.find(place);
+  if (member != inOrder_.end()) lookForAggregator(member->second.level);
+}
+
+void HierarchyGroup::lookForAggregator(uint32_t level) {
+  Session first = getFirstSessionWithHierarchy(level);
+  if (first != nullptr && first->hasAggregator())
+    aggregators_[level] = std::move(first);
+  else
+    aggregators_.erase(level);
 }
 
 HierarchyGroup::Session HierarchyGroup::getFirstSessionWithHierarchy(uint32_t level) const {
@@ -40,12 +58,8 @@ HierarchyGroup::Session HierarchyGroup::getFirstSessionWithHierarchy(uint32_t le
 }
 
 HierarchyGroup::Session HierarchyGroup::firstAggregatorBelow(uint32_t level) const {
-  auto first = byLevel_.begin();
-  while (first != byLevel_.end() && first->first.first < level) {
-    if (first->second->hasAggregator()) return inOrder_.at(first->first.second).session;
-    first = byLevel_.upper_bound({first->first.first, std::numeric_limits<uint64_t>::max()});
-  }
-  return nullptr;
+  const auto first = aggregators_.begin();
+  return first != aggregators_.end() && first->first < level ? first->second : nullptr;
 }
 
 HierarchyGroup::Runs HierarchyGroup::runs() const {

@@ -26,6 +26,8 @@ class HierarchyGroup {
   void remove(uint64_t place);
   // The session at `place` has changed its level. It keeps its place.
   void relevel(uint64_t place);
+  // … or begins or stops aggregating.
+  void aggregationMayHaveChanged(uint64_t place);
 
   [[nodiscard]] bool contains(uint64_t place) const { return inOrder_.count(place) != 0; }
   [[nodiscard]] bool empty() const { return inOrder_.empty(); }
@@ -33,7 +35,7 @@ class HierarchyGroup {
   // The first in order whose level that is, or null.
   [[nodiscard]] Session getFirstSessionWithHierarchy(uint32_t level) const;
   // Of the levels below `level`, lowest first, the first session that aggregates; only the first session of
-  // each level counts.
+  // each level counts. Asked for each message, so the same however many sessions and levels there are.
   [[nodiscard]] Session firstAggregatorBelow(uint32_t level) const;
   // The identifiers of the ancestors of a session at `level`, root first and joined by ".": those of the first
   // sessions of the levels right above it, up to the first level that nobody holds. None when that is the
@@ -60,11 +62,13 @@ class HierarchyGroup {
   };
   using Runs = std::map<uint32_t, Run>;  // by the first level
   [[nodiscard]] Runs runs() const;
+  void lookForAggregator(uint32_t level);
 
   uint64_t nextPlace_ = 1;
   std::map<uint64_t, Member> inOrder_;
   std::map<std::pair<uint32_t, uint64_t>, ReportingdSession*> byLevel_;  // (level, place)
-  mutable std::optional<Runs> runs_;                                     // until the group changes
+  std::map<uint32_t, Session> aggregators_;  // by level, where the first session of the level is one
+  mutable std::optional<Runs> runs_;         // until the group changes
 };
 
 }  // namespace kyt

@@ -66,6 +66,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   std::optional<AncestorIdentifiers> parentSessionIDStringForSession(ReportingdSession& session) override;
   void updateCorrelatedSessions(ReportingdSession& session) override;
   std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(ReportingdSession& session) override;
+  void aggregationMayHaveChanged(ReportingdSession& session) override;
   void updateDownstreamSessions(ReportingdSession& session) override;
   std::shared_ptr<ReportingdSession> parentSessionForChild(ReportingdSession& session) override;
   void updateSharedDataForSession(ReportingdSession& session, const Dictionary& sharedData) override;

@@ -166,6 +166,13 @@ std::shared_ptr<ReportingdSession> ReportingdAgent::getAncestorWithAggregatorFor
   return sessions->firstAggregatorBelow(session.hierarchyLevel());
 }
 
+void ReportingdAgent::aggregationMayHaveChanged(ReportingdSession& session) {
+  MonitorLock lock(monitor_);
+  const auto registration = registrations_.find(&session);
+  if (registration != registrations_.end())
+    _correlatedSessions.at(registration->second.token).aggregationMayHaveChanged(registration->second.place);
+}
+
 void ReportingdAgent::updateDownstreamSessions(ReportingdSession& session) {
   // A standalone session must not wait for somebody's download.
   const std::optional<String> token = session.hierarchyToken();

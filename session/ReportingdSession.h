@@ -93,7 +93,7 @@ class ReportingdSession final : public ClientSessionInterface,
   [[nodiscard]] const std::optional<Dictionary>& sessionInfo() const { return _sessionInfo; }
   [[nodiscard]] bool wasInHierarchy() const { return wasInHierarchy_; }
   [[nodiscard]] bool hasAggregator() const { return _hasAggregator.load(std::memory_order_relaxed); }
-  void setHasAggregator(bool value) { _hasAggregator.store(value, std::memory_order_relaxed); }
+  void setHasAggregator(bool value);
   [[nodiscard]] KYTReportingBackend* backendForKey(std::string_view key) const { return _backends.find(key); }
 
   // Of the session information; 0 without any. Any thread.
@@ -175,6 +175,7 @@ class ReportingdSession final : public ClientSessionInterface,
   // Synchronised by themselves.
   std::atomic<int32_t> clientType_{0};
   std::atomic<bool> figuresChanged_{false};  // and told
+  std::atomic<bool> wasInHierarchy_{false};  // a session that drops its token stays where it is registered
 
   // Touched on the connection's queue alone.
   std::optional<Dictionary> _userInfo;
@@ -188,8 +189,7 @@ class ReportingdSession final : public ClientSessionInterface,
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()
   std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
-  Charge information_;           // for what the client said about itself
-  bool wasInHierarchy_ = false;  // a session that drops its token stays where it is registered
+  Charge information_;  // for what the client said about itself
   bool ended_ = false;
 };
 

@@ -28,6 +28,8 @@ class ReportingdSessionDelegate {
   virtual void updateCorrelatedSessions(ReportingdSession& session) = 0;
   [[nodiscard]] virtual std::shared_ptr<ReportingdSession> getAncestorWithAggregatorForSession(
       ReportingdSession& session) = 0;
+  // A session that is or was in a hierarchy aggregates now, or no longer does.
+  virtual void aggregationMayHaveChanged(ReportingdSession& session) = 0;
   virtual void updateDownstreamSessions(ReportingdSession& session) = 0;
   [[nodiscard]] virtual std::shared_ptr<ReportingdSession> parentSessionForChild(
       ReportingdSession& session) = 0;

@@ -40,6 +40,12 @@ std::optional<String> ReportingdSession::hierarchyToken() const {
   return String(kyt::description(*token));
 }
 
+// The agent knows which members of a hierarchy aggregate, so that no message looks for them.
+void ReportingdSession::setHasAggregator(bool value) {
+  const bool changed = _hasAggregator.exchange(value, std::memory_order_relaxed) != value;
+  if (changed && wasInHierarchy_) _sessionDelegate.aggregationMayHaveChanged(*this);
+}
+
 void ReportingdSession::becomeStandalone() {
   _hierarchyDictionary.reset();
 }

@@ -1,4 +1,8 @@
 // Hierarchies of sessions: parents, combined identifiers, aggregators.
+#include <algorithm>
+#include <chrono>
+#include <random>
+
 #include "tests/daemon/AgentFixture.h"
 
 namespace kyt {
@@ -152,6 +156,68 @@ TEST_F(AgentHierarchy, OnlyTheFirstSessionOfALevelCountsAsAggregator) {
   const Client first = clientWith(sessionInfoAt(0)), second = clientWith(sessionInfoAt(0), true);
   const Client child = clientWith(sessionInfoAt(1));
   EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*child.session), nullptr);
+}
+
+// Compared with a walk over all sessions.
+TEST_F(AgentHierarchy, TheAggregatorIsTheRightOneAfterAnyChanges) {
+  constexpr int kClients = 8, kLevels = 4, kChanges = 3000;
+  std::mt19937 random(7);
+  const auto below = [&](int end) { return static_cast<int>(random() % static_cast<unsigned>(end)); };
+  std::vector<Client> clients;
+  std::vector<size_t> order;  // of registration
+  for (int i = 0; i < kClients; ++i) {
+    clients.push_back(clientWith(sessionInfoAt(below(kLevels))));
+    order.push_back(clients.size() - 1);
+  }
+  const auto expected = [&](const ReportingdSession& session) -> std::shared_ptr<ReportingdSession> {
+    for (uint32_t level = 0; level < session.hierarchyLevel(); ++level)
+      for (const size_t one : order)
+        if (clients[one].session->hierarchyLevel() == level) {
+          if (clients[one].session->hasAggregator()) return clients[one].session;
+          break;
+        }
+    return nullptr;
+  };
+  for (int change = 0; change < kChanges; ++change) {
+    const auto chosen = static_cast<size_t>(below(kClients));
+    Client& client = clients[chosen];
+    switch (below(3)) {
+      case 0:
+        client.session->setHasAggregator(below(3) == 0);
+        break;
+      case 1:  // no token: stays where it is registered
+        client.session->setSessionInfo(Dictionary{{kKYTReportingSessionInfoSessionID, 5}}, std::nullopt,
+                                       nullptr, below(3) == 0);
+        break;
+      default:
+        client.session->setSessionInfo(sessionInfoAt(below(kLevels)), std::nullopt, nullptr, below(3) == 0);
+        std::erase(order, chosen);
+        order.push_back(chosen);
+    }
+    for (const Client& one : clients) {
+      if (!one.session->hierarchyToken()) continue;
+      ASSERT_EQ(agent_.getAncestorWithAggregatorForSession(*one.session), expected(*one.session)) << change;
+    }
+  }
+}
+
+// It is asked for each message of each session of a hierarchy.
+TEST_F(AgentHierarchy, TheAggregatorIsFoundAtTheSameCostHoweverDeepAHierarchyIs) {
+  const auto costAt = [&](int levels, const char* token) {
+    std::vector<Client> clients;
+    for (int level = 0; level < levels; ++level) clients.push_back(clientWith(sessionInfoAt(level, token)));
+    auto least = Duration::max();
+    for (int round = 0; round < 20; ++round) {
+      const auto begin = std::chrono::steady_clock::now();
+      for (int call = 0; call < 200; ++call)
+        EXPECT_EQ(agent_.getAncestorWithAggregatorForSession(*clients.back().session), nullptr);
+      least = std::min<Duration>(least, std::chrono::steady_clock::now() - begin);
+    }
+    return least.count();
+  };
+  const auto shallow = costAt(2, "shallow");
+  EXPECT_LT(costAt(200, "deep"), 4 * shallow);
+  EXPECT_LT(costAt(3000, "deepest"), 8 * shallow) << "whose sessions are no longer in the processor's caches";
 }
 
 TEST_F(AgentHierarchy, AnUpdateShutsDownTheAggregationBeneathAnAggregator) {

@@ -32,6 +32,7 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
   std::vector<Dictionary> updates;
   std::vector<std::string> removedKeys;
   int changes = 0;  // of figures, told
+  int aggregationChanges = 0;
   std::function<void()> onDownstreamUpdate;
 
   // Whether somebody holds the lock, and so keeps another thread from it.
@@ -64,6 +65,7 @@ class FakeSessionDelegate final : public ReportingdSessionDelegate {
     lockedCall("ancestor");
     return ancestor;
   }
+  void aggregationMayHaveChanged(ReportingdSession&) override { ++aggregationChanges; }
   void updateDownstreamSessions(ReportingdSession&) override {
     calls.emplace_back("downstream");
     if (onDownstreamUpdate) onDownstreamUpdate();
