@@ -1,7 +1,9 @@
 #include "platform/linux/entitlements/AccountNumbers.h"
 
+#include <fcntl.h>
 #include <grp.h>
 #include <pwd.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <memory>
@@ -25,12 +27,23 @@ int lookUp(const std::string& name, System system, uint32_t Entry::*number, std:
   return 0;
 }
 
+// Where several sources are asked (nsswitch.conf), one that knows of nobody hides that another could not be read: then
+// nobody has the name, and there is no error. So its file is opened to see. 0: it can be, or there is none.
+int refusalToOpen(const char* file) {
+  const int opened = ::open(file, O_RDONLY | O_CLOEXEC);
+  if (opened < 0) return isMomentary(errno) ? errno : 0;
+  ::close(opened);
+  return 0;
+}
+
 int lookUpUser(const std::string& name, std::optional<uint32_t>& found) {
-  return lookUp<passwd>(name, ::getpwnam_r, &passwd::pw_uid, found);
+  const int error = lookUp<passwd>(name, ::getpwnam_r, &passwd::pw_uid, found);
+  return error == 0 && !found ? refusalToOpen("/etc/passwd") : error;
 }
 
 int lookUpGroup(const std::string& name, std::optional<uint32_t>& found) {
-  return lookUp<struct group>(name, ::getgrnam_r, &group::gr_gid, found);
+  const int error = lookUp<struct group>(name, ::getgrnam_r, &group::gr_gid, found);
+  return error == 0 && !found ? refusalToOpen("/etc/group") : error;
 }
 
 }  // namespace
