@@ -56,6 +56,14 @@ inline constexpr int32_t kBackendStateHeld = 3;  // held by sampling
 // (result, error); a back end that has nothing to say calls it with neither.
 using FlushCompletion = Function<void(Value result, std::optional<Error> error)>;
 
+// Whoever hands on what back ends return: their session. Asked on its queue, before a long text is made.
+class AnswerReader {
+ public:
+  virtual ~AnswerReader() = default;
+  // Whether anybody gets a text of at least so many bytes. What nobody gets has been counted then, where that is due.
+  [[nodiscard]] virtual bool wantsAnswer(size_t leastBytes) = 0;
+};
+
 class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBackend> {
  protected:
   // What a constructor asks for, so that only classes of back ends can make one, through an initWithName(...) that
@@ -82,6 +90,8 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   virtual void cleanup();
   // Of the user whose events these are: what is kept for them counts there. Before the first event.
   void setUserAccount(std::shared_ptr<UserAccount> account) { userAccount_ = std::move(account); }
+  // It outlives the back end. Null, as at first: every text is wanted.
+  void setAnswerReader(AnswerReader* reader) { answerReader_ = reader; }
   void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> delegate);
 
   // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
@@ -90,7 +100,8 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   void setState(int32_t state);
   virtual void updateState();
 
-  // The operation that every event goes through. The returned text goes into the local message log. The message comes by
+  // The operation that every event goes through. The returned text goes into the local message log and into the reply; it
+  // may be missing where the answer reader wants none. The message comes by
   // value, so that the last of several back ends may make its record of it instead of copying it.
   virtual Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                             uint16_t respCode, EventID eventID, MessageFlag flag);
@@ -143,6 +154,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
     return reportingSessionConnectivityDelegate_.lock();
   }
   [[nodiscard]] const std::shared_ptr<UserAccount>& userAccount() const { return userAccount_; }
+  [[nodiscard]] bool isAnswerWanted(size_t leastBytes) const {
+    return answerReader_ == nullptr || answerReader_->wantsAnswer(leastBytes);
+  }
   // Of the latest event.
   [[nodiscard]] uint16_t eventNumber() const { return eventID_; }
   void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }
@@ -178,6 +192,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::optional<Data> digestKey_;
   int32_t digestAlgorithm_ = 0;
   std::shared_ptr<UserAccount> userAccount_;
+  AnswerReader* answerReader_ = nullptr;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
   int32_t state_ GUARDED_BY(*stateQueue_) = kBackendStateUndecided;

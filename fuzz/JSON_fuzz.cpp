@@ -1,9 +1,10 @@
-// JSON texts. What is read must be written to something that reads back equal.
+// JSON texts. What is read must be written to something that reads back equal, and laid out as the writer does.
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
 #include <string>
 
+#include "platform/base/JSONLayout.h"
 #include "platform/linux/data/RapidJSON.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -19,5 +20,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const auto again = json.parse(text);
     if (!std::holds_alternative<kyt::Value>(again) || !(std::get<kyt::Value>(again) == *value)) std::abort();
   }
+  std::string laidOut;
+  kyt::appendLaidOutJSON(laidOut, compact);
+  if (laidOut != pretty) std::abort();
   return 0;
 }

@@ -30,15 +30,28 @@ bool isLogFileName(std::string_view name) {
          name.substr(first + 1, last - first - 1).find('_') == name.npos;
 }
 
-std::string escapedLines(std::string_view text) {
-  std::string out;
-  for (;;) {
-    const size_t end = text.find('\n');
-    appendEscaped(out, text.substr(0, end));
-    if (end == text.npos) return out;
-    out += '\n';
-    text.remove_prefix(end + 1);
+// Enough for the date and what stands around the objects.
+constexpr size_t kRoomForTheRest = 512;
+
+// In one buffer from the beginning: the text of a batch is a megabyte, which costs page faults wherever it is copied.
+std::string lineOf(double now, const char* format, std::initializer_list<Value> objects) {
+  size_t length = kRoomForTheRest;
+  for (const Value& object : objects)
+    if (const String* text = object.string()) length += text->size();
+  std::string line;
+  line.reserve(length);
+  line += '(';
+  line += description(Date{now});
+  line += ") ";
+  const size_t begin = line.size();
+  appendObjects(line, format, objects);
+  if (!isPlainLines(std::string_view(line).substr(begin))) {
+    const std::string text = line.substr(begin);
+    line.resize(begin);
+    appendEscapedLines(line, text);
   }
+  line += '\n';
+  return line;
 }
 
 std::string dateText(const std::optional<Date>& date) {
@@ -66,11 +79,9 @@ void MessageLogFiles::lineIsLost() {
 
 void MessageLogFiles::writeToLogFile(uint32_t user, const char* format,
                                      std::initializer_list<Value> objects) {
-  std::optional<File> file = currentFile();
-  if (!file) file = newFile();
-  if (!file) return lineIsLost();
-  const std::string line =
-      formatObjects("(%@) ", {Date{now()}}) + escapedLines(formatObjects(format, objects)) + "\n";
+  std::optional<File> file = fileForALine();
+  if (!file) return;
+  const std::string line = lineOf(now(), format, objects);
   if (!takeShare(user, file->path, line.size())) return;
   if (file->size + line.size() > Limits::maxMessageLogBytes) {
     if (!beginNext(*file, line.size())) return giveShareBack(user, file->path, line.size());
@@ -86,24 +97,61 @@ void MessageLogFiles::writeToLogFile(uint32_t user, const char* format,
   log_.normal("writeToLogFile: Saved log message to %s", file->path.c_str());
 }
 
+bool MessageLogFiles::takesLine(uint32_t user, size_t leastBytes) {
+  if (!mayLoseLine(user, leastBytes)) return true;
+  const std::optional<File> file = fileForALine();
+  if (!file) return false;
+  if (hasShare(user, file->path, leastBytes)) return true;
+  countShareUsed(user, file->path);
+  return false;
+}
+
+bool MessageLogFiles::mayLoseLine(uint32_t user, size_t bytes) {
+  MutexLock lock(mutex_);
+  const auto share = shares_.find(user);
+  return hasNoFile_ || bytes > mostOfUser_ - (share != shares_.end() ? share->second : 0);
+}
+
+std::optional<MessageLogFiles::File> MessageLogFiles::fileForALine() {
+  std::optional<File> file = currentFile();
+  if (!file) file = newFile();
+  if (!file) lineIsLost();
+  MutexLock lock(mutex_);
+  hasNoFile_ = !file;
+  return file;
+}
+
+uint64_t& MessageLogFiles::shareOf(uint32_t user, const std::string& path) {
+  if (path != sharedFile_) {
+    sharedFile_ = path;
+    shares_.clear();
+  }
+  return shares_[user];
+}
+
+bool MessageLogFiles::hasShare(uint32_t user, const std::string& path, size_t bytes) {
+  MutexLock lock(mutex_);
+  return bytes <= mostOfUser_ - shareOf(user, path);
+}
+
 bool MessageLogFiles::takeShare(uint32_t user, const std::string& path, size_t bytes) {
   {
     MutexLock lock(mutex_);
-    if (path != sharedFile_) {
-      sharedFile_ = path;
-      shares_.clear();
-    }
-    uint64_t& used = shares_[user];
+    uint64_t& used = shareOf(user, path);
     if (bytes <= mostOfUser_ - used) {
       used += bytes;
       return true;
     }
   }
+  countShareUsed(user, path);
+  return false;
+}
+
+void MessageLogFiles::countShareUsed(uint32_t user, const std::string& path) {
   if (counters_.addAndMayLog(Reason::messageLogShareUsed, clock_.monotonic()))
     log_.error(
         "writeToLogFile: User %u has used his part of %s, his lines are left out until the next is begun",
         user, path.c_str());
-  return false;
 }
 
 // A line that was lost after all uses nothing.

@@ -30,6 +30,8 @@ class MessageLogFiles final : public MessageLog {
   MessageLogFiles(std::string folder, FileManager& files, const Clock& clock, Log& log, Counters& counters,
                   uint64_t mostOfUser);
 
+  // Answers by the lines of before where that is enough, so that it costs nothing as long as there is room.
+  [[nodiscard]] bool takesLine(uint32_t user, size_t leastBytes) override;
   // Line breaks within a line stay: they are those of texts that back ends laid out. Other control characters
   // and invalid UTF-8 are escaped. What a client sent as it is must have been escaped by the caller.
   void writeToLogFile(uint32_t user, const char* format, std::initializer_list<Value> objects) override;
@@ -43,10 +45,18 @@ class MessageLogFiles final : public MessageLog {
   [[nodiscard]] std::vector<std::string> listing();
   [[nodiscard]] std::optional<File> currentFile();
   [[nodiscard]] std::optional<File> newFile();
+  // None: no line can be written, which has been counted.
+  [[nodiscard]] std::optional<File> fileForALine() EXCLUDES(mutex_);
+  // Whether the line before was lost, or one of so many bytes would be past the user's share.
+  [[nodiscard]] bool mayLoseLine(uint32_t user, size_t bytes) EXCLUDES(mutex_);
   // False: the line is lost, which has been counted.
   [[nodiscard]] bool beginNext(File& full, size_t wanted);
   // False: the user has used his share of that file, which has been counted.
   [[nodiscard]] bool takeShare(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
+  // As the former, without taking it.
+  [[nodiscard]] bool hasShare(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
+  [[nodiscard]] uint64_t& shareOf(uint32_t user, const std::string& path) REQUIRES(mutex_);
+  void countShareUsed(uint32_t user, const std::string& path);
   void giveShareBack(uint32_t user, const std::string& path, size_t bytes) EXCLUDES(mutex_);
   void deleteFile(const File& file);
   void lineIsLost();
@@ -61,6 +71,7 @@ class MessageLogFiles final : public MessageLog {
   Mutex mutex_;
   std::string sharedFile_ GUARDED_BY(mutex_);               // which one these are the users' parts of
   std::map<uint32_t, uint64_t> shares_ GUARDED_BY(mutex_);  // bytes
+  bool hasNoFile_ GUARDED_BY(mutex_) = false;  // the last line found none, and none could be made
 };
 
 }  // namespace kyt

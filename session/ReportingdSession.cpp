@@ -165,6 +165,7 @@ void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
                           .value_or(Backends());
   for (const auto& [key, backend] : backends) {
     backend->setUserAccount(userAccount_);
+    backend->setAnswerReader(this);
     backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
     backend->setCombinedSessionIDString(_sessionIDString);
   }

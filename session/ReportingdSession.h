@@ -38,6 +38,7 @@ namespace kyt {
 class ReportingSessionConnectivityHelper;
 
 class ReportingdSession final : public ClientSessionInterface,
+                                private AnswerReader,
                                 public std::enable_shared_from_this<ReportingdSession> {
  public:
   // Never fails. The delegate and the class outlive the session; the connection is held until dealloc().
@@ -142,6 +143,9 @@ class ReportingdSession final : public ClientSessionInterface,
   Value routeToBackends(Dictionary envelope, const TimeValue& timestamp, uint16_t category, uint16_t type,
                         MessageFlag flag);
 
+  // The client that waits for an answer, or else the message log.
+  [[nodiscard]] bool wantsAnswer(size_t leastBytes) override;
+
   // Flush and uploads.
   void internalFlushMessagesWithCompletion(ResultReply completion);
   void uploadFileWithURL(const String& fileURL, const String& extensionToken,
@@ -185,6 +189,7 @@ class ReportingdSession final : public ClientSessionInterface,
   Reason withoutBackends_ = Reason::notConfigured;  // why a message finds no back end, when it finds none
   std::bitset<static_cast<size_t>(Reason::numberOfReasons)> toldDrops_;
   bool toldOddNumbers_ = false;
+  bool isAnswerAwaited_ = false;  // of the call that is being served
   bool _hasFinishedGracefully = false;
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()

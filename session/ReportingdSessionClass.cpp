@@ -19,6 +19,17 @@ bool boolEntry(const Dictionary& dictionary, const char* key) {
   return value != nullptr && value->boolValue();
 }
 
+// Nobody waits for what the back ends return for a single message.
+class MessageLogReader final : public AnswerReader {
+ public:
+  MessageLogReader(MessageLog& messageLog, uint32_t user) : messageLog_(messageLog), user_(user) {}
+  bool wantsAnswer(size_t leastBytes) override { return messageLog_.takesLine(user_, leastBytes); }
+
+ private:
+  MessageLog& messageLog_;
+  const uint32_t user_;
+};
+
 }  // namespace
 
 ReportingdSessionClass::ReportingdSessionClass(Configuration configuration, BackendFactory& backendFactory,
@@ -63,6 +74,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
   }
   char deviceID[kDeviceIDSize] = {};
   deviceIdentity().deviceUniqueIDCString(deviceID, kDeviceIDSize);
+  MessageLogReader reader(messageLog_, user);
   const std::optional<Backends> backends =
       backendFactory_.createBackends(storebag, sessionInfo, userInfo, deviceID);
   if (!backends || backends->empty()) {
@@ -77,6 +89,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
   const TimeValue timestamp = platform().clock.timeOfDay();
   for (const auto& [key, backend] : *backends) {
     backend->setUserAccount(account);
+    backend->setAnswerReader(&reader);
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
     if (!backend->isWhitelistedEvent(category)) {

@@ -41,6 +41,7 @@ void ReportingdSession::internalFlushMessagesWithCompletion(ResultReply completi
     if (completion) completion(nullptr, Error{kKYTReportingErrorDomain, -1, text});
     return;
   }
+  isAnswerAwaited_ = static_cast<bool>(completion);
   auto fanIn = std::make_shared<FlushFanIn>(class_, peerUser_, std::move(completion),
                                             static_cast<int32_t>(_backends.size()));
   for (const auto& [key, backend] : _backends) {
@@ -50,6 +51,7 @@ void ReportingdSession::internalFlushMessagesWithCompletion(ResultReply completi
           fanIn->backendFinished(key, name, std::move(result), std::move(error));
         }));
   }
+  isAnswerAwaited_ = false;
   figuresMayHaveChanged();
 }
 

@@ -13,8 +13,14 @@ namespace kyt {
 
 void ReportingdSession::sendMessageWithDictionary(Dictionary message, ObjectReply reply) {
   log().debug("sendMessageWithDictionary: Sending message for session %u", _sessionID);
+  isAnswerAwaited_ = static_cast<bool>(reply);
   Value answer = sendMessageWithDictionaryError(std::move(message));
+  isAnswerAwaited_ = false;
   if (reply) reply(std::move(answer));
+}
+
+bool ReportingdSession::wantsAnswer(size_t leastBytes) {
+  return isAnswerAwaited_ || class_.messageLog().takesLine(peerUser_, leastBytes);
 }
 
 namespace {

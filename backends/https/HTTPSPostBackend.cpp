@@ -199,21 +199,24 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
       })) {
     platform().log.debug(
         "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here to keep events in order.");
-    flushed = flushMessagesWithCompletion(nullptr);
+    flushed = flush(nullptr, TextOf::flushAndEvent);
   }
   platform().log.debug("HTTPSPostBackend(sendMessage): Sending %d, %d, %d", state, batchEvents(),
                        facts().requireUserInfo);
   Array records;
   records.append(Value(std::move(record)));
+  PostRequest::Message message = makeMessage(std::move(records), true);
+  const String* before = flushed.string();
+  const size_t least =
+      (message.mayBeShown ? message.prettySize : 0) + (before != nullptr ? before->size() : 0);
   Value text;
-  size_t events = 0;
-  std::optional<std::string> json = createMessageForPostAndLogging(std::move(records), &text, &events);
-  if (!json) return {};
-  if (!flushed.isNull()) {
-    text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
-    immutable_ = true;
+  if ((message.mayBeShown || before != nullptr) && isAnswerWanted(least)) {
+    if (message.mayBeShown) text = PostRequest::prettyText(message.json);
+    if (before != nullptr)
+      text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
   }
-  postJSONMessage(std::move(*json), flag, method, respCode, nullptr, events);
+  if (before != nullptr) immutable_ = true;
+  postJSONMessage(std::move(message.json), flag, method, respCode, nullptr, message.events);
   return text;
 }
 
@@ -239,15 +242,19 @@ PostFacts HTTPSPostBackend::postFacts() const {
   return post;
 }
 
+PostRequest::Message HTTPSPostBackend::makeMessage(Array records, bool asksWhetherItMayBeShown) {
+  PostRequest::Message message =
+      PostRequest(configuration_, postFacts()).message(std::move(records), asksWhetherItMayBeShown);
+  jsonSizeHint_ = message.json.size();
+  return message;
+}
+
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array records,
                                                                             Value* prettyJSONString,
                                                                             size_t* events) {
-  PostRequest::Message message =
-      PostRequest(configuration_, postFacts()).message(std::move(records), prettyJSONString != nullptr);
-  jsonSizeHint_ = message.json.size();
+  PostRequest::Message message = makeMessage(std::move(records), prettyJSONString != nullptr);
   if (events != nullptr) *events = message.events;
-  if (prettyJSONString != nullptr && !message.prettyText.isNull())
-    *prettyJSONString = std::move(message.prettyText);
+  if (message.mayBeShown) *prettyJSONString = PostRequest::prettyText(message.json);
   return std::move(message.json);
 }
 

@@ -95,6 +95,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] bool immutable() const { return immutable_; }
 
  private:
+  enum class TextOf { flush, flushAndEvent };
   enum class BatchTaking { nothing, discarded, userInfoMissing, taken };
   struct Device {             // what the device says when the back end is made
     bool dnuEnabled = false;  // the user's consent to diagnostics-and-usage upload
@@ -106,10 +107,13 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] const Dictionary* userInfo() const { return userInfoDict() ? &*userInfoDict() : nullptr; }
   [[nodiscard]] bool lacksUserInfo() const;
   void addStopEntries(Dictionary& payload) const;
+  [[nodiscard]] PostRequest::Message makeMessage(Array records, bool asksWhetherItMayBeShown);
   Value sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                        MessageFlag flag);
 
   // The batch.
+  // The text of the flush alone is made where somebody wants it, that of one that goes before an event always.
+  Value flush(FlushCompletion completion, TextOf text);
   [[nodiscard]] bool hasRoomFor(uint64_t batched, uint64_t bytes) const;
   void giveBackToUser(uint64_t bytes) const;
   void countDroppedByLimit() const;

@@ -116,6 +116,10 @@ void HTTPSPostBackend::tellDiscarded(size_t events, const char* why) const {
 }
 
 Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) {
+  return flush(std::move(completion), TextOf::flush);
+}
+
+Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
   EventBatch::Taken batch;
   const BatchTaking taking = stateQueue().sync([&] {
     stateQueue().assertCurrent();
@@ -140,22 +144,24 @@ Value HTTPSPostBackend::flushMessagesWithCompletion(FlushCompletion completion) 
   platform().log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   const uint64_t bytes = batch.bytes;
   Array records = recordsToPost(std::move(batch));
-  Value pretty;
-  std::optional<std::string> json;
-  size_t events = 0;
-  if (!records.empty()) json = createMessageForPostAndLogging(std::move(records), &pretty, &events);
-  giveBackToUser(bytes);  // the request counts by itself
-  if (!json) {
+  if (records.empty()) {
+    giveBackToUser(bytes);
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
     return {};
   }
+  PostRequest::Message message = makeMessage(std::move(records), true);
+  Value pretty;
+  if (message.mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
+    pretty = PostRequest::prettyText(message.json);
+  giveBackToUser(bytes);  // the request counts by itself
   FlushCompletion answer;
   if (completion)
     answer = [pretty, completion = std::move(completion)](const Value&, std::optional<Error> error) mutable {
       completion(pretty, std::move(error));
     };
-  postJSONMessage(std::move(*json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer), events);
-  if (!pretty.isNull()) immutable_ = true;
+  postJSONMessage(std::move(message.json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer),
+                  message.events);
+  if (message.mayBeShown) immutable_ = true;
   return pretty;
 }
 

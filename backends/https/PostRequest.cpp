@@ -14,6 +14,7 @@
 #include "platform/Platform.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
+#include "platform/base/JSONLayout.h"
 #include "platform/base/UserBudget.h"
 #include "platform/objects/Description.h"
 #include "platform/queues/Log.h"
@@ -43,6 +44,22 @@ bool isPostable(const Value& value) {
   }
 }
 
+// What laying out adds to a dictionary's entry at that depth: a line break, the indentation, the blank behind the colon.
+constexpr size_t roomOfEntries(size_t depth) {
+  return 1 + 4 * depth + 1;
+}
+
+// To the list of records, whose values are no containers: what is between its brackets and the texts in it.
+size_t roomOfTheLayout(const Array& records) {
+  constexpr size_t kLineOfRecord = 1 + 4 * 2, kLineOfListsEnd = 1 + 4;
+  size_t room = records.empty() ? 0 : kLineOfListsEnd;
+  for (const Value& record : records) {
+    const size_t entries = record.dictionary()->size();
+    room += kLineOfRecord + entries * roomOfEntries(3) + (entries != 0 ? kLineOfRecord : 0);
+  }
+  return room;
+}
+
 }  // namespace
 
 PostRequest::PostRequest(const Configuration& configuration, PostFacts facts)
@@ -65,7 +82,7 @@ void PostRequest::removeUnpostable(Dictionary& record) const {
   });
 }
 
-bool PostRequest::mayShowPrettyText() const {
+bool PostRequest::mayBeShown() const {
   // Asked in any case: it says in the log what it finds.
   const uint32_t environment = configuration_.environment.userDefaultsEnvironment();
   const bool inSuchAnEnvironment =
@@ -73,14 +90,15 @@ bool PostRequest::mayShowPrettyText() const {
   return (facts_.settingShowsText && inSuchAnEnvironment) || facts_.consentShowsText;
 }
 
-PostRequest::Message PostRequest::message(Array records, bool wantsPrettyText) const {
+PostRequest::Message PostRequest::message(Array records, bool asksWhetherItMayBeShown) const {
   Platform& platform = configuration_.platform;
   Value* values = records.mutableBegin();
   for (size_t i = 0; i < records.size(); ++i) removeUnpostable(*values[i].mutableDictionary());
+  Message made;
+  made.prettySize = roomOfTheLayout(records);
   Dictionary entries;
   entries.reserve(3);
   entries.append("postTime", finiteOrMinusOne(platform.clock.timeOfDay().asSeconds()));
-  Message made;
   // Deliberately a list that ends at the first missing object: servers know that events never come without
   // a client ID, and that such a message carries its time alone.
   if (facts_.clientID) {
@@ -89,16 +107,21 @@ PostRequest::Message PostRequest::message(Array records, bool wantsPrettyText) c
     entries.append("events", Value(std::move(records)));
   } else {
     platform.counters.add(Reason::postWithoutClientID, records.size());
+    made.prettySize = 0;
   }
+  made.prettySize += entries.size() * roomOfEntries(1) + 1;
   const Value message(std::move(entries));
   made.json.reserve(facts_.sizeHint + facts_.sizeHint / 8);
   platform.json.writeCompact(message, made.json);
-  if (wantsPrettyText && mayShowPrettyText()) {
-    std::string pretty;
-    platform.json.writePretty(message, pretty);
-    made.prettyText = Value(pretty);
-  }
+  made.prettySize += made.json.size();
+  if (asksWhetherItMayBeShown) made.mayBeShown = mayBeShown();
   return made;
+}
+
+Value PostRequest::prettyText(std::string_view json) {
+  std::string pretty;
+  appendLaidOutJSON(pretty, json);
+  return Value(pretty);
 }
 
 // On any but an internal build events go over https alone.

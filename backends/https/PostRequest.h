@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "backend/SessionFacts.h"
 #include "config/Configuration.h"
@@ -39,21 +40,24 @@ struct EventMap {
 class PostRequest {
  public:
   struct Message {
-    std::string json;   // the body before compression
-    Value prettyText;   // null unless it was wanted and may be shown
-    size_t events = 0;  // records in the body: all, or none without a client ID
+    std::string json;         // the body before compression
+    bool mayBeShown = false;  // as a pretty text; not looked at unless that was asked
+    size_t prettySize = 0;    // of that text, in bytes
+    size_t events = 0;        // records in the body: all, or none without a client ID
   };
 
   PostRequest(const Configuration& configuration, PostFacts facts);
 
-  [[nodiscard]] Message message(Array records, bool wantsPrettyText) const;
+  [[nodiscard]] Message message(Array records, bool asksWhetherItMayBeShown) const;
+  // The same message for people. Made of its text, so it costs little, and nothing where nobody asks.
+  [[nodiscard]] static Value prettyText(std::string_view json);
   // `url` is as the storebag gives it.
   [[nodiscard]] URLRequest request(const String& url, std::string json,
                                    const std::optional<EventMap>& eventMap) const;
 
  private:
   void removeUnpostable(Dictionary& record) const;
-  [[nodiscard]] bool mayShowPrettyText() const;
+  [[nodiscard]] bool mayBeShown() const;
   [[nodiscard]] std::string addressWithForcedScheme(const String& url) const;
   [[nodiscard]] std::string digestOfBody(const Data& body) const;
 

@@ -103,6 +103,28 @@ std::string escapedText(std::string_view text) {
   return out;
 }
 
+void appendEscapedLines(std::string& out, std::string_view text) {
+  for (;;) {
+    const size_t end = text.find('\n');
+    appendEscaped(out, text.substr(0, end));
+    if (end == text.npos) return;
+    out += '\n';
+    text.remove_prefix(end + 1);
+  }
+}
+
+bool isPlainLines(std::string_view text) {
+  constexpr size_t kPiece =
+      64;  // compilers make a few instructions of a loop of constant length without branches
+  const auto isOdd = [](char c) { return static_cast<unsigned>(!isPlainASCII(c)) & (c != '\n'); };
+  for (; text.size() >= kPiece; text.remove_prefix(kPiece)) {
+    unsigned odd = 0;
+    for (size_t i = 0; i < kPiece; ++i) odd |= isOdd(text[i]);
+    if (odd != 0) return false;
+  }
+  return std::none_of(text.begin(), text.end(), isOdd);
+}
+
 size_t lengthThatFits(std::string_view text, size_t escapedBytes) {
   size_t end = 0;
   for (size_t used = 0; end < text.size();) {

@@ -15,10 +15,14 @@ namespace kyt {
 
 void appendEscaped(std::string& out, std::string_view text);
 [[nodiscard]] std::string escapedText(std::string_view text);
+// The same with the line breaks of the text left as they are.
+void appendEscapedLines(std::string& out, std::string_view text);
 // How much of the text, whole characters, becomes at most so many bytes when it is escaped.
 [[nodiscard]] size_t lengthThatFits(std::string_view text, size_t escapedBytes);
 // Whether escapedText() would change nothing.
 [[nodiscard]] bool isPlainText(std::string_view text);
+// Whether the text is of ASCII that is shown as it is, and line breaks: then appendEscapedLines() changes nothing. Quick.
+[[nodiscard]] bool isPlainLines(std::string_view text);
 // The length of the valid UTF-8 sequence that `text` begins with, 0 when there is none.
 [[nodiscard]] size_t utf8SequenceLength(std::string_view text);
 [[nodiscard]] bool isValidUTF8(std::string_view text);

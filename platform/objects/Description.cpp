@@ -190,8 +190,13 @@ std::string description(const Value& value) {
 }
 
 std::string formatObjects(const char* format, std::initializer_list<Value> objects) {
-  const std::string_view text(format);
   std::string out;
+  appendObjects(out, format, objects);
+  return out;
+}
+
+void appendObjects(std::string& out, const char* format, std::initializer_list<Value> objects) {
+  const std::string_view text(format);
   const Value* next = objects.begin();
   for (size_t i = 0; i < text.size(); ++i) {
     const size_t conversion =
@@ -207,7 +212,6 @@ std::string formatObjects(const char* format, std::initializer_list<Value> objec
     }
     i = conversion;
   }
-  return out;
 }
 
 }  // namespace kyt

@@ -11,5 +11,6 @@ namespace kyt {
 // Fills a "%@" template: every conversion, "%@", "%s", "%u" or another (its flags and width are ignored),
 // takes the next object's description; a missing object prints as "(null)"; "%%" is a percent sign.
 [[nodiscard]] std::string formatObjects(const char* format, std::initializer_list<Value> objects);
+void appendObjects(std::string& out, const char* format, std::initializer_list<Value> objects);
 
 }  // namespace kyt

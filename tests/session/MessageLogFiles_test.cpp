@@ -350,6 +350,48 @@ TEST_F(MessageLogFilesTest, LinesThatCouldNotBeWrittenDoNotUseAUsersShare) {
   EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 0U);
 }
 
+TEST_F(MessageLogFilesTest, TakesALineAsLongAsTheUsersShareHasRoomForIt) {
+  EXPECT_TRUE(log_.takesLine(1, 100)) << "nothing has been written";
+  EXPECT_TRUE(files_.files().empty()) << "and nothing was looked at";
+  EXPECT_FALSE(log_.takesLine(1, Limits::maxMessageLogBytesPerUser + 1));
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 1U);
+  const std::string much = quarterOfAShare(line("").size());
+  for (int i = 0; i < 4; ++i) write(much, 1);
+  const std::string file = logFile("1769860800");
+  sink_.clear();
+  clock_.advance(std::chrono::minutes(1));
+  EXPECT_FALSE(log_.takesLine(1, 1));
+  EXPECT_FALSE(log_.takesLine(1, 1));
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 3U) << "as if it had been written";
+  EXPECT_EQ(
+      sink_.count(LogLevel::error, "writeToLogFile: User 1 has used his part of " + file + ", his lines"),
+      1U);
+  EXPECT_TRUE(log_.takesLine(2, 1)) << "another user's";
+  EXPECT_EQ(contents().at(file).size(), Limits::maxMessageLogBytesPerUser);
+}
+
+TEST_F(MessageLogFilesTest, TakesALineAgainWhenTheNextFileIsDue) {
+  for (int i = 0; i < 4; ++i) write(quarterOfAShare(line("").size()), 1);
+  EXPECT_FALSE(log_.takesLine(1, 1));
+  clock_.advance(std::chrono::hours(25));
+  EXPECT_TRUE(log_.takesLine(1, 1));
+  write("again", 1);
+  EXPECT_TRUE(contents().begin()->second.ends_with(" again\n"));
+  EXPECT_EQ(counters_.value(Reason::messageLogShareUsed), 1U);
+}
+
+TEST_F(MessageLogFilesTest, TakesNoLineWhereTheOneBeforeFoundNoFile) {
+  files_.setFaults({.createFile = true});
+  EXPECT_TRUE(log_.takesLine(1, 1)) << "nobody knows yet";
+  write();
+  EXPECT_FALSE(log_.takesLine(1, 1));
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 2U);
+  files_.setFaults({});
+  EXPECT_TRUE(log_.takesLine(1, 1));
+  write();
+  EXPECT_EQ(counters_.value(Reason::messageLogLineLost), 2U);
+}
+
 TEST_F(MessageLogFilesTest, KeepsLineBreaksAndEscapesOtherControlCharacters) {
   write("{\n    \"a\" : 1\n}\x1b[2J\r\xff\xe2\x80\xae\x7f\t.");
   EXPECT_EQ(contents().at(logFile("1769860800")),

@@ -58,6 +58,23 @@ TEST_F(SessionFlush, AnswersWithTheResultOfTheLastToFinish) {
   EXPECT_TRUE(logged(LogLevel::debug, "internalFlushMessagesWithCompletion: dashboard"));
 }
 
+TEST_F(SessionFlush, WantsTextsForAClientThatWaitsAndOtherwiseAsTheMessageLogDoes) {
+  configure({"httppost"});
+  backend("httppost").answer = Value("text");
+  backend("httppost").answersIfWanted = 100;
+  messageLog_.setFull(true);
+  flush();
+  EXPECT_EQ(result_, Value("text"));
+  EXPECT_TRUE(messageLog_.asked().empty());
+  EXPECT_EQ(messageLog_.lines().size(), 1U);
+  client_.session->flushMessagesWithCompletion(nullptr);
+  EXPECT_EQ(messageLog_.lines().size(), 1U);
+  EXPECT_EQ(messageLog_.asked(), std::vector<size_t>{100});
+  messageLog_.setFull(false);
+  client_.session->flushMessagesWithCompletion(nullptr);
+  EXPECT_EQ(messageLog_.lines().size(), 2U);
+}
+
 TEST_F(SessionFlush, AnswersAtOnceWithTheFirstError) {
   configureHolding({"httppost", "dashboard", "qdx"});
   flush();

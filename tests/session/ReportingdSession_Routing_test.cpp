@@ -33,6 +33,28 @@ TEST_F(MessageRouting, DropsAMessageWithoutCategoryOrType) {
   EXPECT_TRUE(sentTo("httppost").empty());
 }
 
+TEST_F(MessageRouting, WantsATextForAClientThatWaitsWhateverTheMessageLogTakes) {
+  configure({"httppost"});
+  backend("httppost").answer = Value("text");
+  backend("httppost").answersIfWanted = 100;
+  messageLog_.setFull(true);
+  EXPECT_EQ(send(message(9, 200)), Value("text"));
+  EXPECT_TRUE(messageLog_.asked().empty());
+  EXPECT_EQ(messageLog_.lines().size(), 1U);
+}
+
+TEST_F(MessageRouting, WantsATextThatNoClientWaitsForAsTheMessageLogDoes) {
+  configure({"httppost"});
+  backend("httppost").answer = Value("text");
+  backend("httppost").answersIfWanted = 100;
+  client_.session->sendMessageWithDictionary(message(9, 200), nullptr);
+  EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[httppost -> sendMessageWithDictionary] text"});
+  messageLog_.setFull(true);
+  client_.session->sendMessageWithDictionary(message(9, 200), nullptr);
+  EXPECT_EQ(messageLog_.lines().size(), 1U);
+  EXPECT_EQ(messageLog_.asked(), (std::vector<size_t>{100, 100}));
+}
+
 TEST_F(MessageRouting, HandsTheMessageToTheBackEnds) {
   configure({"httppost", "qdx"});
   test_.clock.advance(std::chrono::seconds(5));
@@ -237,6 +259,19 @@ TEST_F(SingleMessage, NeedsAStorebag) {
   EXPECT_EQ(client_.session->sessionID(), 42U);
   EXPECT_TRUE(logged(LogLevel::debug,
                      "sendMessageWithSessionInfo: Sending message with session info for session 42"));
+}
+
+TEST_F(SingleMessage, WantsATextAsTheMessageLogDoes) {
+  delegate_.storebag = table({"httppost"});
+  factory_.prepare = [](RecordingBackend& made) {
+    made.answer = "sent";
+    made.answersIfWanted = 100;
+  };
+  EXPECT_EQ(sendSingle(sessionInfo()), "finished");
+  messageLog_.setFull(true);
+  EXPECT_EQ(sendSingle(sessionInfo()), "finished");
+  EXPECT_EQ(messageLog_.asked(), (std::vector<size_t>{100, 100}));
+  EXPECT_EQ(messageLog_.lines(), std::vector<std::string>{"[httppost -> sendMessageWithSessionInfo] sent"});
 }
 
 TEST_F(SingleMessage, IsSentThroughBackEndsOfItsOwn) {

@@ -33,6 +33,8 @@ class RecordingBackend final : public KYTReportingBackend {
 
   // How it answers.
   Value answer;  // of a send
+  std::optional<size_t>
+      answersIfWanted;  // it asks for a text of so many bytes first, and flushes give `answer` too
   bool acceptsFiles = false, acceptsLogData = false;
   uint64_t batchSize = 0;
   int32_t stateAfterUpdate = kBackendStateEnabled;
@@ -63,11 +65,12 @@ class RecordingBackend final : public KYTReportingBackend {
     calls.emplace_back("send");
     sent.push_back({std::move(message), timestamp, method, respCode, static_cast<uint16_t>(eventID),
                     static_cast<int32_t>(flag)});
-    return answer;
+    return isWanted() ? answer : Value();
   }
   Value flushMessagesWithCompletion(FlushCompletion completion) override {
     calls.emplace_back("flush");
     ++flushCount;
+    if (answersIfWanted) flushResult = isWanted() ? answer : Value();
     if (holdsFlushes)
       flushes.push_back(std::move(completion));
     else
@@ -105,6 +108,9 @@ class RecordingBackend final : public KYTReportingBackend {
     ++sizeQuestions;
     return batchSize;
   }
+
+ private:
+  [[nodiscard]] bool isWanted() const { return !answersIfWanted || isAnswerWanted(*answersIfWanted); }
 };
 
 // Thread-safe; the back ends that it made are not.

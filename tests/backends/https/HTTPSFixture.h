@@ -103,12 +103,14 @@ class HTTPSFixture : public testing::Test {
     const Dictionary message{{kKYTReportingMessageBlobClientData, std::move(payload)}};
     return backend().sendMessage(message, TimeValue{1000000025, 500000}, method, respCode, MessageFlag{flag});
   }
+  // A request's body before compression.
+  std::string body(size_t index) {
+    std::string text(poster_->requests.at(index).body.view());
+    return poster_->header(index, "Content-Encoding") == "gzip" ? unzipped(text) : text;
+  }
   Value message(size_t index) {
-    const URLRequest& request = poster_->requests.at(index);
-    std::string body(request.body.view());
-    if (poster_->header(index, "Content-Encoding") == "gzip") body = unzipped(body);
-    std::variant<Value, Error> parsed = platform_.json.parse(body);
-    EXPECT_TRUE(std::holds_alternative<Value>(parsed)) << body;
+    std::variant<Value, Error> parsed = platform_.json.parse(body(index));
+    EXPECT_TRUE(std::holds_alternative<Value>(parsed)) << body(index);
     return std::holds_alternative<Value>(parsed) ? std::get<Value>(parsed) : Value();
   }
   // The records of a posted message.

@@ -135,6 +135,75 @@ TEST_F(HTTPSPostBackendBatch, ARealtimeEventFlushesTheBatchFirst) {
       "Flush here to keep events in order."));
 }
 
+// Says whether texts are wanted, and keeps what it was asked.
+struct Reader final : AnswerReader {
+  bool wantsAnswer(size_t leastBytes) override {
+    asked.push_back(leastBytes);
+    return wants;
+  }
+  bool wants = false;
+  std::vector<size_t> asked;
+};
+
+TEST_F(HTTPSPostBackendBatch, MakesNoTextThatNobodyWantsAndFreezesTheStateAllTheSame) {
+  Reader reader;
+  inState(kBackendStateEnabled);
+  backend().setAnswerReader(&reader);
+  send(5);
+  FlushAnswer answer;
+  EXPECT_TRUE(backend().flushMessagesWithCompletion(answer.completion()).isNull());
+  EXPECT_TRUE(backend().immutable());
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(events(0).size(), 1u);
+  poster_->answer(0, 200);
+  EXPECT_EQ(answer.calls, 1);
+  EXPECT_TRUE(answer.result.isNull());
+  EXPECT_EQ(answer.error, std::nullopt);
+  EXPECT_EQ(reader.asked, std::vector<size_t>{PostRequest::prettyText(body(0)).string()->size()});
+}
+
+TEST_F(HTTPSPostBackendBatch, MakesTheTextThatIsWantedAsLongAsItSaid) {
+  Reader reader;
+  reader.wants = true;
+  inState(kBackendStateEnabled);
+  backend().setAnswerReader(&reader);
+  send(5);
+  const Value text = backend().flushMessagesWithCompletion(nullptr);
+  ASSERT_TRUE(text.isString());
+  ASSERT_EQ(reader.asked.size(), 1u);
+  EXPECT_EQ(text.string()->size(), reader.asked[0]);
+}
+
+TEST_F(HTTPSPostBackendBatch, AsksOnceForTheTextOfAnEventAndOfTheFlushBeforeIt) {
+  Reader reader;
+  reader.wants = true;
+  inState(kBackendStateEnabled);
+  backend().setAnswerReader(&reader);
+  send(5);
+  const Value both = send(6, {}, 1);
+  ASSERT_TRUE(both.isString());
+  ASSERT_EQ(reader.asked.size(), 1u);
+  EXPECT_GE(both.string()->size(), reader.asked[0]);
+  EXPECT_GT(reader.asked[0], both.string()->size() - 50) << "all but what stands between them";
+  reader.wants = false;
+  send(5);
+  EXPECT_TRUE(send(6, {}, 1).isNull());
+  EXPECT_EQ(reader.asked.size(), 2u);
+  EXPECT_EQ(poster_->requests.size(), 4u);
+}
+
+TEST_F(HTTPSPostBackendBatch, AsksForNoTextThatMayNotBeShown) {
+  Reader reader;
+  platform_.consent.setAllowed(false);
+  entry_.set("override_dnu", 1);
+  inState(kBackendStateEnabled);
+  backend().setAnswerReader(&reader);
+  send(5);
+  send(6, {}, 1);
+  EXPECT_EQ(poster_->requests.size(), 2u);
+  EXPECT_TRUE(reader.asked.empty());
+}
+
 TEST_F(HTTPSPostBackendBatch, WhereNothingMayBeShownNothingIsReturnedAndNothingFrozen) {
   platform_.consent.setAllowed(false);
   entry_.set("override_dnu", 1);

@@ -23,8 +23,8 @@ class PostRequestTest : public testing::Test {
     platform_.clock.setTimeOfDay({1000000130, 250000});
   }
   PostRequest post() { return {platform_.configuration, facts_}; }
-  PostRequest::Message message(Array records, bool wantsPrettyText = true) {
-    return post().message(std::move(records), wantsPrettyText);
+  PostRequest::Message message(Array records, bool asksWhetherItMayBeShown = true) {
+    return post().message(std::move(records), asksWhetherItMayBeShown);
   }
   URLRequest request(std::string json = "{}", const std::optional<EventMap>& eventMap = std::nullopt) {
     return post().request("https://post.example.org/events?k", std::move(json), eventMap);
@@ -60,15 +60,35 @@ TEST_F(PostRequestTest, WhatCannotBePostedLeavesTheRecord) {
   EXPECT_TRUE(records[0].dictionary()->contains("list")) << "the caller's own are left alone";
 }
 
-TEST_F(PostRequestTest, ThePrettyTextIsMadeWhereItIsWantedAndMayBeShown) {
+TEST_F(PostRequestTest, AMessageMayBeShownByConsentAndByASettingInSomeEnvironments) {
   const Array records{Dictionary{{"k", 1}}};
-  EXPECT_TRUE(message(records).prettyText.isNull());
+  EXPECT_FALSE(message(records).mayBeShown);
   facts_.settingShowsText = true;  // in environments that are no user's
-  EXPECT_TRUE(message(records).prettyText.isNull());
+  EXPECT_FALSE(message(records).mayBeShown);
   facts_.consentShowsText = true;
-  EXPECT_TRUE(message(records, false).prettyText.isNull());
-  ASSERT_TRUE(message(records).prettyText.isString());
-  EXPECT_NE(message(records).prettyText.string()->view().find("\n"), std::string_view::npos);
+  EXPECT_FALSE(message(records, false).mayBeShown) << "not asked";
+  EXPECT_TRUE(message(records).mayBeShown);
+}
+
+TEST_F(PostRequestTest, ThePrettyTextIsThatOfTheWriter) {
+  const PostRequest::Message made =
+      message(Array{Dictionary{{"text", "a\n\"b\" \\ {[,:"}, {"number", -1.5}, {"empty", ""}}, Dictionary()});
+  std::string pretty;
+  platform_.json.writePretty(std::get<Value>(platform_.json.parse(made.json)), pretty);
+  EXPECT_EQ(PostRequest::prettyText(made.json), Value(pretty));
+}
+
+TEST_F(PostRequestTest, AMessageKnowsTheSizeOfItsPrettyText) {
+  for (const Array& records : {Array{}, Array{Dictionary()}, Array{Dictionary{{"k", 1}}, Dictionary()},
+                               Array{Dictionary{{"list", Array{1}}, {"date", Date{5.5}}, {"text", "a\n\"{,"}},
+                                     Dictionary{{"a", true}, {"b", -1.5}}}}) {
+    facts_.clientID = String("an identifier");
+    const PostRequest::Message made = message(records);
+    EXPECT_EQ(made.prettySize, PostRequest::prettyText(made.json).string()->size()) << made.json;
+    facts_.clientID = std::nullopt;
+    const PostRequest::Message empty = message(records);
+    EXPECT_EQ(empty.prettySize, PostRequest::prettyText(empty.json).string()->size()) << empty.json;
+  }
 }
 
 TEST_F(PostRequestTest, TheHeadersSayWhoSends) {

@@ -6,8 +6,11 @@
 #include <rapidjson/writer.h>
 
 #include <cmath>
+#include <iterator>
 #include <random>
 #include <string>
+
+#include "platform/base/JSONLayout.h"
 
 namespace kyt {
 namespace {
@@ -157,6 +160,51 @@ TEST(RapidJSON, RefusesEscapedSurrogatesThatStandAlone) {
   for (const char* text : {R"(["\uDDDD"])", R"(["\uD800"])", R"({"\uDC00": 1})", R"(["\uD800\uD800"])"})
     EXPECT_TRUE(std::holds_alternative<Error>(json.parse(text))) << text;
   EXPECT_EQ(std::get<Value>(json.parse(R"(["\uD83D\uDE00"])")), Value(Array{"\xF0\x9F\x98\x80"}));
+}
+
+// Of any kind, texts with what is escaped among them.
+Value anything(std::mt19937& random, int depth) {
+  static constexpr std::string_view kPieces[] = {"a", "\"", "\\", "\n",   "{",        "}",         "[",
+                                                 "]", ",",  ":",  "\x01", "\xC3\xBC", "0123456789"};
+  const auto text = [&] {
+    std::string made;
+    for (size_t left = random() % 12; left != 0; --left) made += kPieces[random() % std::size(kPieces)];
+    return made;
+  };
+  switch (random() % (depth < 4 ? 8 : 6)) {
+    case 0:
+      return Value();
+    case 1:
+      return Value(random() % 2 == 0);
+    case 2:
+      return Value(static_cast<int64_t>(random()) - 2000000000);
+    case 3:
+      return Value(static_cast<double>(random()) * 1e300);
+    case 4:
+      return Value(static_cast<double>(random()) / 7);
+    case 5:
+      return Value(text());
+    case 6: {
+      Array array;
+      for (size_t left = random() % 5; left != 0; --left) array.append(anything(random, depth + 1));
+      return Value(std::move(array));
+    }
+    default: {
+      Dictionary dictionary;
+      for (size_t left = random() % 5; left != 0; --left) dictionary.set(text(), anything(random, depth + 1));
+      return Value(std::move(dictionary));
+    }
+  }
+}
+
+TEST(RapidJSON, LaysOutAsTheLayoutOfItsCompactText) {
+  std::mt19937 random(5);
+  for (int i = 0; i < 3000; ++i) {
+    const Value value = anything(random, 0);
+    std::string laidOut;
+    appendLaidOutJSON(laidOut, compact(value));
+    ASSERT_EQ(laidOut, pretty(value)) << compact(value);
+  }
 }
 
 }  // namespace

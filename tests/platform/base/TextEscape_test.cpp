@@ -58,5 +58,26 @@ TEST(BeginningOf, TellsLongTextsApartAndLeavesShortOnes) {
   EXPECT_EQ(beginningOf(std::string(20, '\x80')), "...");
 }
 
+TEST(TextEscape, LeavesLineBreaksOfLines) {
+  std::string out = "> ";
+  appendEscapedLines(out, "a\n\x01\n\xC2\x85\xC3\xBC\r\n");
+  EXPECT_EQ(out, "> a\n\\x01\n\\xc2\\x85\xC3\xBC\\r\n");
+}
+
+TEST(TextEscape, KnowsLinesThatStayAsTheyAre) {
+  const std::string plain(200, 'x');
+  EXPECT_TRUE(isPlainLines(""));
+  EXPECT_TRUE(isPlainLines("{\n    \"~\": 1\n}\n"));
+  EXPECT_TRUE(isPlainLines(plain));
+  for (const char c : {'\0', '\t', '\r', '\x1F', '\x7F', '\x80', '\xC3', '\xFF'}) {
+    EXPECT_FALSE(isPlainLines(std::string(1, c)));
+    for (size_t at = 0; at < plain.size(); ++at) {
+      std::string text = plain;
+      text[at] = c;
+      EXPECT_FALSE(isPlainLines(text)) << at;
+    }
+  }
+}
+
 }  // namespace
 }  // namespace kyt
