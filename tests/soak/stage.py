@@ -250,8 +250,11 @@ class Stage:
         """The processes that the daemon has started."""
         found = []
         for task in os.listdir(f"/proc/{self.daemon.pid}/task"):
-            with open(f"/proc/{self.daemon.pid}/task/{task}/children") as file:
-                found += file.read().split()
+            try:
+                with open(f"/proc/{self.daemon.pid}/task/{task}/children") as file:
+                    found += file.read().split()
+            except (FileNotFoundError, ProcessLookupError):
+                pass  # a thread that has just ended; the first one, which starts them, has not
         return found
 
     def note_stall(self, seconds):
