@@ -23,9 +23,9 @@
 #include <thread>
 
 #include "platform/base/Counters.h"
+#include "platform/base/Semaphore.h"
 #include "platform/linux/url/CurlURLSession.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 
 namespace {
 

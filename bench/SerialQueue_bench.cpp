@@ -7,8 +7,8 @@
 #include <mutex>
 #include <thread>
 
+#include "platform/base/Semaphore.h"
 #include "platform/fake/ManualExecutor.h"
-#include "platform/queues/Semaphore.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/WorkerPool.h"
 

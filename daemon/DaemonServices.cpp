@@ -4,9 +4,9 @@
 #include <utility>
 
 #include "backends/BackendTable.h"
+#include "platform/base/Semaphore.h"
 #include "platform/linux/base/Threads.h"
 #include "platform/linux/service/Process.h"
-#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 

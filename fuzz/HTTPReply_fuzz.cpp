@@ -14,9 +14,9 @@
 
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
+#include "platform/base/Semaphore.h"
 #include "platform/linux/url/CurlURLSession.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 
 namespace {
 

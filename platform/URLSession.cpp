@@ -5,8 +5,8 @@
 #include <utility>
 
 #include "platform/base/Limits.h"
+#include "platform/base/Semaphore.h"
 #include "platform/base/UserBudget.h"
-#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 

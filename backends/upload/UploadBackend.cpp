@@ -11,13 +11,13 @@
 #include "backend/PayloadCompression.h"
 #include "platform/FileExtension.h"
 #include "platform/Platform.h"
+#include "platform/base/Blocking.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
 #include "platform/base/TextEscape.h"
 #include "platform/objects/Description.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

@@ -1,5 +1,5 @@
 // Waiting on a Mutex in a way that the thread-safety analysis follows. Waits may end spuriously: callers loop
-// over their condition. Whoever waits for long announces that first (BlockingScope in WorkerPool.h).
+// over their condition. Whoever waits for long announces that first (BlockingScope).
 #pragma once
 
 #include <condition_variable>

@@ -3,9 +3,9 @@
 #include <chrono>
 #include <utility>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/SpinPause.h"
 #include "platform/queues/SerialQueue.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

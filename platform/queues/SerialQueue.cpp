@@ -11,7 +11,6 @@
 #include <utility>
 
 #include "platform/base/SpinPause.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 
@@ -282,13 +281,16 @@ void SerialQueue::discardPending() {
 }
 
 Turn::Turn() : outermost_(currentTurn == nullptr) {
-  if (outermost_) currentTurn = this;
+  if (!outermost_) return;
+  currentTurn = this;
+  HeldBack::exchange(this);
 }
 
 Turn::~Turn() {
   if (!outermost_) return;
   runDeferred();
   currentTurn = nullptr;
+  HeldBack::exchange(nullptr);
 }
 
 Turn* Turn::current() noexcept {

@@ -25,6 +25,7 @@
 #include <type_traits>
 #include <vector>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/Function.h"
 #include "platform/base/Mutex.h"
 #include "platform/queues/Executor.h"
@@ -113,7 +114,7 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
 // very thread. Nested turns join the outer one. runDeferred() may be called earlier (before a wait, say).
 // While a turn blocks (BlockingScope), what it deferred is handed to the executor first, so that it never
 // waits for the blocker.
-class Turn {
+class Turn final : private HeldBack {
  public:
   Turn();
   ~Turn();
@@ -132,6 +133,7 @@ class Turn {
  private:
   friend class SerialQueue;
   void defer(std::shared_ptr<SerialQueue> queue);
+  void giveAway() override { handDeferredToExecutors(); }
 
   bool outermost_;
   size_t first_ = 0, end_ = 0;  // what is left to run of near_ with far_ behind it

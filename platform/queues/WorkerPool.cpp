@@ -12,6 +12,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Mutex.h"
@@ -448,25 +449,6 @@ void WorkerPool::Worker::willBlock(BlockingKind kind) {
 }
 void WorkerPool::Worker::hasBlocked() {
   pool->unblock(*this);
-}
-
-namespace {
-
-thread_local BlockingObserver* blockingObserver = nullptr;
-
-}  // namespace
-
-BlockingObserver* BlockingObserver::exchange(BlockingObserver* observer) noexcept {
-  return std::exchange(blockingObserver, observer);
-}
-
-BlockingScope::BlockingScope(BlockingKind kind) : observer_(blockingObserver) {
-  if (Turn* turn = Turn::current()) turn->handDeferredToExecutors();
-  if (observer_ != nullptr && observer_->depth_++ == 0) observer_->willBlock(kind);
-}
-
-BlockingScope::~BlockingScope() {
-  if (observer_ != nullptr && --observer_->depth_ == 0) observer_->hasBlocked();
 }
 
 }  // namespace kyt

@@ -68,35 +68,4 @@ class WorkerPool final : public Executor {
   std::unique_ptr<Implementation> implementation_;
 };
 
-// What a thread waits for: others that hold a lock, or anything else.
-enum class BlockingKind : uint8_t { inLine, other };
-
-// Who is told when its thread is about to wait: a worker, so that its pool keeps others running, and the
-// reactor, so that another thread goes on waiting for events. Nested waits are told once.
-class BlockingObserver {
- public:
-  virtual ~BlockingObserver() = default;
-  virtual void willBlock(BlockingKind kind) = 0;
-  virtual void hasBlocked() = 0;
-  // Of the calling thread; null: none. Returns the former one.
-  static BlockingObserver* exchange(BlockingObserver* observer) noexcept;
-
- private:
-  friend class BlockingScope;
-  unsigned depth_ = 0;
-};
-
-// Announces that this thread is about to wait for something that takes long. No effect on threads without an
-// observer. Before it waits, whatever this thread's turn deferred is handed to the executors.
-class BlockingScope {
- public:
-  explicit BlockingScope(BlockingKind kind = BlockingKind::other);
-  ~BlockingScope();
-  BlockingScope(const BlockingScope&) = delete;
-  BlockingScope& operator=(const BlockingScope&) = delete;
-
- private:
-  BlockingObserver* observer_;
-};
-
 }  // namespace kyt

@@ -13,8 +13,8 @@
 #include <thread>
 #include <vector>
 
+#include "platform/base/Semaphore.h"
 #include "platform/base/UUIDText.h"
-#include "platform/queues/Semaphore.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 

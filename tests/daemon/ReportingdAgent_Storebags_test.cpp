@@ -3,7 +3,6 @@
 #include <vector>
 
 #include "platform/UserDefaults.h"
-#include "platform/queues/WorkerPool.h"
 #include "tests/daemon/AgentFixture.h"
 
 namespace kyt {

@@ -5,6 +5,7 @@
 
 #include "WireTestSupport.h"
 #include "platform/Entitlements.h"
+#include "platform/base/Blocking.h"
 #include "platform/base/Limits.h"
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/ManualExecutor.h"
@@ -13,7 +14,6 @@
 #include "platform/fake/MemoryStream.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

@@ -16,10 +16,10 @@
 #include <fstream>
 #include <iostream>
 
+#include "platform/base/Semaphore.h"
 #include "platform/base/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
 #include "platform/objects/Keys.h"
-#include "platform/queues/Semaphore.h"
 #include "tools/feed/Event.h"
 #include "tools/feed/Machine.h"
 

@@ -5,8 +5,8 @@
 
 #include <algorithm>
 
+#include "platform/base/Blocking.h"
 #include "platform/linux/base/Descriptors.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

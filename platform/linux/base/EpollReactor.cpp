@@ -23,12 +23,12 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/LeaderThreads.h"
 #include "platform/queues/SerialQueue.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

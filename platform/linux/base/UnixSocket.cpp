@@ -13,9 +13,9 @@
 #include <cstring>
 #include <utility>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/Limits.h"
 #include "platform/linux/base/Descriptors.h"
-#include "platform/queues/WorkerPool.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77

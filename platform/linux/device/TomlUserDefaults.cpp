@@ -8,8 +8,8 @@
 #include <thread>
 #include <utility>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/Limits.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

@@ -15,8 +15,8 @@
 #include <cstring>
 #include <span>
 
+#include "platform/base/Blocking.h"
 #include "platform/linux/confinement/Capabilities.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

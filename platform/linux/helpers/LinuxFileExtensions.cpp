@@ -8,10 +8,10 @@
 #include <string>
 #include <utility>
 
+#include "platform/base/Blocking.h"
 #include "platform/base/Counters.h"
 #include "platform/linux/files/Files.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

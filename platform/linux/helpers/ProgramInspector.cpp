@@ -9,8 +9,8 @@
 #include <cerrno>
 #include <cstdio>
 
+#include "platform/base/Blocking.h"
 #include "platform/linux/confinement/Capabilities.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 

@@ -8,9 +8,9 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/base/Blocking.h"
 #include "platform/linux/files/Files.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

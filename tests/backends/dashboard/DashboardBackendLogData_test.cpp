@@ -2,8 +2,8 @@
 #include <thread>
 
 #include "platform/base/Limits.h"
+#include "platform/base/Semaphore.h"
 #include "platform/objects/KeyedArchive.h"
-#include "platform/queues/Semaphore.h"
 #include "tests/backends/dashboard/DashboardFixture.h"
 
 namespace kyt {

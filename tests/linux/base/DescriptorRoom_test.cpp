@@ -7,7 +7,7 @@
 #include <fstream>
 #include <string>
 
-#include "platform/queues/WorkerPool.h"
+#include "platform/base/Blocking.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/NoDescriptors.h"
 

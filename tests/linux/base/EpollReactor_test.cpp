@@ -18,10 +18,10 @@
 #include <system_error>
 #include <thread>
 
+#include "platform/base/Semaphore.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/LinuxClock.h"
 #include "platform/linux/base/Threads.h"
-#include "platform/queues/Semaphore.h"
 #include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TimerServiceContract.h"

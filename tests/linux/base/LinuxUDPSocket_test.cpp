@@ -9,8 +9,8 @@
 #include <string>
 
 #include "platform/base/InternetAddress.h"
+#include "platform/base/Semaphore.h"
 #include "platform/linux/base/EpollReactor.h"
-#include "platform/queues/Semaphore.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/UDPPeer.h"
 

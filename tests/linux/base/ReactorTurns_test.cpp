@@ -12,11 +12,12 @@
 #include <thread>
 #include <vector>
 
+#include "platform/base/Blocking.h"
+#include "platform/base/Semaphore.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/linux/base/Descriptors.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/Threads.h"
-#include "platform/queues/Semaphore.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"

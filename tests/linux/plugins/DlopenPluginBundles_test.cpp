@@ -9,8 +9,8 @@
 #include <filesystem>
 #include <string>
 
+#include "platform/base/Blocking.h"
 #include "platform/fake/MemoryLogSink.h"
-#include "platform/queues/WorkerPool.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {

@@ -10,8 +10,8 @@
 #include <system_error>
 
 #include "platform/base/Limits.h"
+#include "platform/base/Semaphore.h"
 #include "platform/base/UserBudget.h"
-#include "platform/queues/Semaphore.h"
 #include "tests/linux/url/CurlURLSessionFixture.h"
 #include "tests/support/Sanitizers.h"
 

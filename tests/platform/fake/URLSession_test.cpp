@@ -10,9 +10,9 @@
 #include <thread>
 #include <utility>
 
+#include "platform/base/Blocking.h"
+#include "platform/base/Semaphore.h"
 #include "platform/fake/FakeURLSession.h"
-#include "platform/queues/Semaphore.h"
-#include "platform/queues/WorkerPool.h"
 
 namespace kyt {
 namespace {

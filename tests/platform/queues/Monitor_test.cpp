@@ -10,7 +10,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/queues/Semaphore.h"
+#include "platform/base/Semaphore.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"

@@ -9,8 +9,8 @@
 #include <thread>
 #include <vector>
 
+#include "platform/base/Semaphore.h"
 #include "platform/fake/ManualExecutor.h"
-#include "platform/queues/Semaphore.h"
 
 namespace kyt {
 namespace {

@@ -1,5 +1,6 @@
 // The elastic pool: how many run, who waits, what blocked workers and shut-down do.
 #include "platform/queues/WorkerPool.h"
+#include "platform/base/Blocking.h"
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
@@ -15,9 +16,9 @@
 #include <vector>
 
 #include "platform/base/Counters.h"
+#include "platform/base/Semaphore.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/queues/Log.h"
-#include "platform/queues/Semaphore.h"
 #include "platform/queues/SerialQueue.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/Sanitizers.h"

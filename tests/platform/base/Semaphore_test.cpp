@@ -1,5 +1,5 @@
 // Counting, waiting with a deadline, and waking.
-#include "platform/queues/Semaphore.h"
+#include "platform/base/Semaphore.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
-#include "platform/queues/Semaphore.h"
+#include "platform/base/Semaphore.h"
 
-#include "platform/queues/WorkerPool.h"
+#include "platform/base/Blocking.h"
 
 namespace kyt {
 
