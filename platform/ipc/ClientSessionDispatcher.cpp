@@ -340,16 +340,12 @@ const char* ClientSessionDispatcher::handleStandard(const Message& message, cons
 const char* ClientSessionDispatcher::introspect(const Message& message, const Peer& peer) const {
   if (!message.body.empty())
     return refuse(message, peer, wire::kErrorInvalidArgs, "the method takes no arguments");
-  std::string text;
-  if (message.path == wire::kSessionPath) {
-    text = options_.introspection;
-  } else {
-    text.append(kDocumentType)
-        .append("<node>\n  <node name=\"")
-        .append(childOf(message.path))
-        .append("\"/>\n</node>\n");
-  }
-  replyTo(message, peer).answer("s", [&](MessageWriter& out) { out.writeString(text); });
+  replyTo(message, peer).answer("s", [&](MessageWriter& out) {
+    if (message.path == wire::kSessionPath) return out.writeString(options_.introspection);
+    std::string text = kDocumentType;
+    text.append("<node>\n  <node name=\"").append(childOf(message.path)).append("\"/>\n</node>\n");
+    out.writeString(text);
+  });
   return nullptr;
 }
 
