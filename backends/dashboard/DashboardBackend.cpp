@@ -199,7 +199,7 @@ DashboardDatagram::Header DashboardBackend::headerFor(const TimeValue& timestamp
   header.eventID = static_cast<uint16_t>(eventID);
   header.flags = static_cast<uint16_t>((reliableUDP_ ? DashboardDatagram::kFlagReliable : 0) |
                                        (usingProfile_ ? 0 : DashboardDatagram::kFlagWithoutProfile));
-  header.udid = facts().udid ? facts().udid->c_str() : "";
+  if (facts().udid) header.udid = facts().udid->c_str();
   return header;
 }
 
@@ -234,7 +234,7 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
   appendPairs(message, *datagram);
   datagram->finish();
 
-  Value line = writeLocalLog(datagram->bytes());
+  Value line = writeLocalLog(*datagram);
   networkProcQueue_->async([self = std::static_pointer_cast<DashboardBackend>(shared_from_this()),
                             datagram = std::move(datagram), eventID] {
     self->networkProcQueue_->assertCurrent();
@@ -243,17 +243,14 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
   return line;
 }
 
-String DashboardBackend::writeLocalLog(const std::byte* datagram) {
-  using Datagram = DashboardDatagram;
-  char device[Datagram::kDeviceSize + 1] = {};
-  std::copy_n(reinterpret_cast<const char*>(datagram + 20), Datagram::kDeviceSize, device);
+String DashboardBackend::writeLocalLog(const DashboardDatagram& datagram) {
+  const DashboardDatagram::Header header = datagram.header();
   char line[1152];
-  std::snprintf(
-      line, sizeof line, "%u.%03d %s 127.0.0.1 %s %5u %5u %5u %5u %5u %s", Datagram::number32(datagram + 4),
-      std::to_integer<int>(datagram[3]) * 4, device, clientTypeShortCode(std::to_integer<int>(datagram[1])),
-      static_cast<uint16_t>(~Datagram::number16(datagram + 12)), ~Datagram::number32(datagram + 8),
-      Datagram::number16(datagram + Datagram::kEventIDOffset), Datagram::number16(datagram + 16),
-      Datagram::number16(datagram + 18), reinterpret_cast<const char*>(datagram + Datagram::kHeaderSize));
+  std::snprintf(line, sizeof line, "%u.%03d %.*s 127.0.0.1 %s %5u %5u %5u %5u %5u %s",
+                static_cast<uint32_t>(header.time.seconds), header.time.microseconds / 1000,
+                static_cast<int>(header.udid.size()), header.udid.data(),
+                clientTypeShortCode(header.clientType), header.clientVersion, header.sessionID,
+                header.eventID, header.method, header.respCode, datagram.text());
   return line;
 }
 

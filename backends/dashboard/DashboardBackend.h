@@ -65,7 +65,7 @@ class DashboardBackend : public KYTReportingBackend {
   // left.
   [[nodiscard]] static String sanitize(const String& text);
   // `datagram` is a whole one, its text terminated.
-  [[nodiscard]] static String writeLocalLog(const std::byte* datagram);
+  [[nodiscard]] static String writeLocalLog(const DashboardDatagram& datagram);
 
   [[nodiscard]] SerialQueue& networkProcQueue() const RETURN_CAPABILITY(*networkProcQueue_) {
     return *networkProcQueue_;

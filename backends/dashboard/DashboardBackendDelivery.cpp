@@ -68,11 +68,10 @@ void DashboardBackend::processSocketRead() {
   std::array<std::byte, DashboardDatagram::kSize> buffer{};
   const int64_t received = socket_->receive(buffer);
   static_cast<void>(readSource_.rearm());
-  // Nothing else of an acknowledgement is looked at, and what is too short to hold a number is none.
-  constexpr int64_t kShortest = DashboardDatagram::kEventIDOffset + 2;
-  if (received < kShortest) return;
-  const uint16_t acknowledged =
-      DashboardDatagram::number16(buffer.data() + DashboardDatagram::kEventIDOffset);
+  if (received < 0) return;
+  const std::optional<uint16_t> acknowledged =
+      DashboardDatagram::acknowledgedEvent(std::span(buffer).first(static_cast<size_t>(received)));
+  if (!acknowledged) return;
   for (auto packet = messageQueue_.begin(); packet != messageQueue_.end(); ++packet) {
     if ((*packet)->eventNumber() != acknowledged) continue;
     messageQueue_.erase(packet);

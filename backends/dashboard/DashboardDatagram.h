@@ -5,6 +5,8 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <optional>
+#include <span>
 #include <string_view>
 
 #include "platform/base/Clock.h"
@@ -16,18 +18,15 @@ class DashboardDatagram {
   static constexpr size_t kHeaderSize = 64;
   static constexpr size_t kTextSize = 1024;  // its terminator included, which is not sent
   static constexpr size_t kSize = kHeaderSize + kTextSize;
-  static constexpr size_t kDeviceSize = 40;
-  static constexpr size_t kEventIDOffset = 60;  // in acknowledgements too
   static constexpr uint16_t kFlagReliable = 1;
   static constexpr uint16_t kFlagWithoutProfile = 2;
-  static constexpr int32_t kTimeUnit = 4000;  // microseconds
 
   struct Header {
     uint8_t selfVersionMajor = 0, clientType = 0;
-    TimeValue time;
+    TimeValue time;  // read back it has seconds of 32 bits, and steps of four milliseconds
     uint32_t sessionID = 0;
     uint16_t clientVersion = 0, method = 0, respCode = 0, eventID = 0, flags = 0;
-    const char* udid = "";
+    std::string_view udid;  // at most 40 bytes are sent
   };
 
   // Everything but the length, which appendPair() and finish() keep.
@@ -38,13 +37,21 @@ class DashboardDatagram {
 
   [[nodiscard]] uint16_t length() const { return static_cast<uint16_t>(kHeaderSize + textLength_); }
   [[nodiscard]] const std::byte* bytes() const { return bytes_.data(); }
+  // What stands in it; the texts are valid as long as the datagram.
+  [[nodiscard]] Header header() const;
+  [[nodiscard]] const char* text() const {
+    return reinterpret_cast<const char*>(bytes_.data() + kHeaderSize);
+  }
 
-  // Of any bytes in which there is room for them.
-  [[nodiscard]] static uint16_t number16(const std::byte* bytes);
-  [[nodiscard]] static uint32_t number32(const std::byte* bytes);
+  // The number of the event that an acknowledgement is about. Nothing else of one is looked at, and what is too short to
+  // hold a number is none.
+  [[nodiscard]] static std::optional<uint16_t> acknowledgedEvent(std::span<const std::byte> received);
 
  private:
-  void put(size_t offset, uint64_t number, size_t width);
+  struct Field;
+  struct Fields;
+  void put(const Field& field, uint64_t number);
+  [[nodiscard]] uint32_t number(const Field& field) const;
   [[nodiscard]] char* text() { return reinterpret_cast<char*>(bytes_.data() + kHeaderSize); }
   std::array<std::byte, kSize> bytes_{};
   size_t textLength_ = 0;
