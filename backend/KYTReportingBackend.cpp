@@ -104,7 +104,7 @@ Value KYTReportingBackend::flushMessagesWithCompletion(FlushCompletion completio
   return {};
 }
 
-bool KYTReportingBackend::uploadFileAtPath(const String&, const String&, std::optional<FileExtension>&) {
+bool KYTReportingBackend::uploadFileAtPath(const String&, const String&, FileOffer&) {
   return false;
 }
 

@@ -113,10 +113,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
                     MessageFlag flag);
 
   virtual Value flushMessagesWithCompletion(FlushCompletion completion);
-  // `extension` names the descriptors that came with the token; the back end that accepts takes them from
-  // there.
+  // `offer` has the descriptors that came with the token; a back end that uploads files takes them.
   [[nodiscard]] virtual bool uploadFileAtPath(const String& path, const String& extensionToken,
-                                              std::optional<FileExtension>& extension);
+                                              FileOffer& offer);
   [[nodiscard]] virtual bool uploadLogData(const Value& logData);
   virtual void setCorrelatedSessionID(const SessionIDPath& sessionID);
   // Without a list everything is allowed; an empty list allows nothing.

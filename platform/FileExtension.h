@@ -10,6 +10,7 @@
 #include <memory>
 #include <optional>
 #include <string_view>
+#include <utility>
 #include <variant>
 #include <vector>
 
@@ -37,6 +38,18 @@ enum class FileReadError : uint8_t {
   failed
 };
 
+// One upload's descriptors while it is offered to back ends, one after the other: the first that takes them owns them,
+// and for the others there are none. What nobody took is closed at destruction.
+class FileOffer {
+ public:
+  explicit FileOffer(std::optional<FileExtension> extension) : extension_(std::move(extension)) {}
+  // None where none came with the call, or somebody took them before.
+  [[nodiscard]] std::optional<FileExtension> take() { return std::exchange(extension_, std::nullopt); }
+
+ private:
+  std::optional<FileExtension> extension_;
+};
+
 // What a consumed token gives. Released at destruction.
 class FileAccess {
  public:
@@ -57,9 +70,9 @@ class FileAccess {
 class FileExtensions {
  public:
   virtual ~FileExtensions() = default;
-  // Takes the descriptors. Null for an empty token, and when none came with the call.
+  // Null for an empty token, and without descriptors; then those that are given are closed.
   [[nodiscard]] virtual std::unique_ptr<FileAccess> consume(std::string_view token,
-                                                            std::optional<FileExtension>& extension) = 0;
+                                                            std::optional<FileExtension> extension) = 0;
 };
 
 }  // namespace kyt

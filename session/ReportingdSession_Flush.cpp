@@ -66,11 +66,12 @@ void ReportingdSession::uploadFileWithURL(const String& fileURL, const String& e
                                           std::optional<FileExtension> extension,
                                           SuccessReply completionHandler) {
   const std::optional<String> path = pathOfFileURL(fileURL);
+  FileOffer offer(std::move(extension));
   bool success = false;
   // A URL that names no file is asked of nobody.
   if (path) {
     for (const auto& [key, backend] : _backends)
-      if (backend->uploadFileAtPath(*path, extensionToken, extension)) success = true;
+      if (backend->uploadFileAtPath(*path, extensionToken, offer)) success = true;
   }
   const char* shownPath = path ? path->c_str() : "(null)";
   if (success)

@@ -128,12 +128,11 @@ UploadBackend::UploadBackend(Making making, Platform& platform, String name, Dic
     if (const String* text = url->string()) setDisplayURL(*text);
 }
 
-bool UploadBackend::uploadFileAtPath(const String& path, const String& extensionToken,
-                                     std::optional<FileExtension>& extension) {
+bool UploadBackend::uploadFileAtPath(const String& path, const String& extensionToken, FileOffer& offer) {
   Log& log = platform().log;
   log.normal("UploadBackend(uploadFileAtPath): Uploading file %s", path.c_str());
   if (!uploadURL_) return false;
-  const std::unique_ptr<FileAccess> file = platform().fileExtensions.consume(extensionToken, extension);
+  const std::unique_ptr<FileAccess> file = platform().fileExtensions.consume(extensionToken, offer.take());
   if (file == nullptr || !file->isReadableRegularFile()) {
     log.error("UploadBackend(uploadFileAtPath): Only upload a regular file.");
     return false;

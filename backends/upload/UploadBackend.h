@@ -26,7 +26,7 @@ class UploadBackend : public KYTReportingBackend {
 
   // True once a request was built and handed to the poster, whatever the server then answers.
   [[nodiscard]] bool uploadFileAtPath(const String& path, const String& extensionToken,
-                                      std::optional<FileExtension>& extension) override;
+                                      FileOffer& offer) override;
 
   [[nodiscard]] const std::optional<String>& uploadURL() const { return uploadURL_; }
   void setUploadURL(std::optional<String> value) { uploadURL_ = std::move(value); }

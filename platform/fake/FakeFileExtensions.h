@@ -30,7 +30,7 @@ class FakeFileExtensions final : public FileExtensions {
   uint64_t heldBytes = 0;    // that the last access said
 
   [[nodiscard]] std::unique_ptr<FileAccess> consume(std::string_view token,
-                                                    std::optional<FileExtension>&) override {
+                                                    std::optional<FileExtension>) override {
     tokens.emplace_back(token);
     if (!grants || token.empty()) return nullptr;
     return std::make_unique<Access>(*this);

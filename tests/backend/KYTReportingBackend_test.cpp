@@ -194,8 +194,8 @@ TEST_F(KYTReportingBackendTest, TheBaseAloneDoesNothing) {
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}).isNull());
   EXPECT_TRUE(plain->sendMessage({}, {}, 1, 1, EventID{}, MessageFlag{}).isNull());
   EXPECT_EQ(platform_.counters.value(Reason::notForThisBackEnd), 3u) << "each by itself";
-  std::optional<FileExtension> extension;
-  EXPECT_FALSE(plain->uploadFileAtPath("/a", "token", extension));
+  FileOffer offer(std::nullopt);
+  EXPECT_FALSE(plain->uploadFileAtPath("/a", "token", offer));
   EXPECT_FALSE(plain->uploadLogData(Value(Array{})));
   EXPECT_EQ(plain->batchedEventsSize(), 0u);
   plain->cleanup();

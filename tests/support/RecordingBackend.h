@@ -77,7 +77,7 @@ class RecordingBackend final : public KYTReportingBackend {
       completion(flushResult, flushError);
     return nullptr;
   }
-  bool uploadFileAtPath(const String& path, const String& token, std::optional<FileExtension>&) override {
+  bool uploadFileAtPath(const String& path, const String& token, FileOffer&) override {
     uploadedPaths.push_back(path.str());
     tokens.push_back(token.str());
     return acceptsFiles;

@@ -81,12 +81,10 @@ class LinuxFileExtensions::Access final : public FileAccess {
 };
 
 std::unique_ptr<FileAccess> LinuxFileExtensions::consume(std::string_view token,
-                                                         std::optional<FileExtension>& extension) {
+                                                         std::optional<FileExtension> extension) {
   if (token.empty() || !extension) return nullptr;
   if (extension->file.get() < 0 || extension->folder.get() < 0) return nullptr;
-  FileExtension taken = std::move(*extension);
-  extension.reset();
-  return std::make_unique<Access>(*this, std::move(taken));
+  return std::make_unique<Access>(*this, std::move(*extension));
 }
 
 }  // namespace kyt

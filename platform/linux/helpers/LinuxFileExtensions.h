@@ -24,7 +24,7 @@ class LinuxFileExtensions final : public FileExtensions {
   LinuxFileExtensions(const DeletionBroker* broker, Log& log, Counters& counters, UserBudget& budget)
       : broker_(broker), log_(log), counters_(counters), budget_(budget) {}
   [[nodiscard]] std::unique_ptr<FileAccess> consume(std::string_view token,
-                                                    std::optional<FileExtension>& extension) override;
+                                                    std::optional<FileExtension> extension) override;
 
  private:
   class Access;

@@ -74,8 +74,8 @@ class Upload : public testing::Test {
     return *backend_;
   }
   bool upload(const char* path = "/tmp/report.log", const char* token = "token") {
-    std::optional<FileExtension> extension;
-    const bool sent = backend().uploadFileAtPath(path, token, extension);
+    FileOffer offer(std::nullopt);
+    const bool sent = backend().uploadFileAtPath(path, token, offer);
     EXPECT_EQ(platform_.fileExtensions.held, 0) << "the access is still held";
     return sent;
   }

@@ -47,8 +47,8 @@ TEST(UploadWireExample, IsWhatIsSent) {
                                                    Dictionary{{"post_url", "https://upload.example.org/in"}},
                                                    std::make_shared<SessionFacts>(facts));
   backend->setReportingSessionConnectivityDelegate(poster);
-  std::optional<FileExtension> extension;
-  ASSERT_TRUE(backend->uploadFileAtPath("/tmp/reports/call #1.log", "token", extension));
+  FileOffer offer(std::nullopt);
+  ASSERT_TRUE(backend->uploadFileAtPath("/tmp/reports/call #1.log", "token", offer));
 
   std::string request = poster->request.method + " " + poster->request.url;
   for (const auto& [name, value] : poster->request.headers) request += "\n" + name + ": " + value;

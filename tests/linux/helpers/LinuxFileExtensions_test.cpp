@@ -41,17 +41,11 @@ class FileExtensionTest : public testing::Test {
   std::optional<FileExtension> extension(int file) const {
     return FileExtension{ownDescriptor(file), folder(), {::geteuid(), ::getegid(), {}}};
   }
-  std::unique_ptr<FileAccess> access(int file) {
-    auto given = extension(file);
-    return extensions_->consume("token", given);
-  }
+  std::unique_ptr<FileAccess> access(int file) { return extensions_->consume("token", extension(file)); }
   std::unique_ptr<FileAccess> access(const std::string& path, int flags = O_RDONLY) {
     const int file = ::open(path.c_str(), flags | O_CLOEXEC | O_NONBLOCK, 0600);
     EXPECT_GE(file, 0) << path;
-    auto given = extension(file);
-    std::unique_ptr<FileAccess> taken = extensions_->consume("token", given);
-    EXPECT_FALSE(given);
-    return taken;
+    return extensions_->consume("token", extension(file));
   }
   static std::string contents(FileAccess& file, uint64_t maxBytes = kPlenty) {
     auto read = file.readWhole(maxBytes);
@@ -83,34 +77,30 @@ TEST_F(FileExtensionTest, ReadsAndRemovesTheFileThatWasPassed) {
 
 TEST_F(FileExtensionTest, OnlyDescriptorsCountAndNoTextOfAToken) {
   const std::string mine = folder_.write("mine", "mine"), theirs = folder_.write("theirs", "theirs");
-  auto given = extension(::open(theirs.c_str(), O_RDONLY | O_CLOEXEC));
-  const auto first = extensions_->consume("the token", given);
+  FileOffer offer(extension(::open(theirs.c_str(), O_RDONLY | O_CLOEXEC)));
+  const auto first = extensions_->consume("the token", offer.take());
   ASSERT_NE(first, nullptr);
   // The same text opens nothing a second time, and in another call what came with that call.
-  std::optional<FileExtension> none;
-  EXPECT_EQ(extensions_->consume("the token", none), nullptr);
-  EXPECT_EQ(extensions_->consume("the token", given), nullptr);
-  auto other = extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC));
-  const auto second = extensions_->consume("the token", other);
+  EXPECT_EQ(extensions_->consume("the token", std::nullopt), nullptr);
+  EXPECT_EQ(extensions_->consume("the token", offer.take()), nullptr) << "it was taken";
+  const auto second =
+      extensions_->consume("the token", extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC)));
   ASSERT_NE(second, nullptr);
   EXPECT_EQ(contents(*second), "mine");
-  auto path = extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC));
-  const auto third = extensions_->consume(theirs, path);
+  const auto third = extensions_->consume(theirs, extension(::open(mine.c_str(), O_RDONLY | O_CLOEXEC)));
   ASSERT_NE(third, nullptr);
   EXPECT_EQ(contents(*third), "mine");
 }
 
 TEST_F(FileExtensionTest, AnEmptyTokenAndMissingDescriptorsGrantNothing) {
   const std::string path = folder_.write("a", "1");
-  auto given = extension(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  EXPECT_EQ(extensions_->consume("", given), nullptr);
-  std::optional<FileExtension> none;
-  EXPECT_EQ(extensions_->consume("token", none), nullptr);
+  EXPECT_EQ(extensions_->consume("", extension(::open(path.c_str(), O_RDONLY | O_CLOEXEC))), nullptr);
+  EXPECT_EQ(extensions_->consume("token", std::nullopt), nullptr);
   std::optional<FileExtension> withoutFile = FileExtension{Descriptor(), folder(), {}};
-  EXPECT_EQ(extensions_->consume("token", withoutFile), nullptr);
+  EXPECT_EQ(extensions_->consume("token", std::move(withoutFile)), nullptr);
   std::optional<FileExtension> withoutFolder =
       FileExtension{ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC)), Descriptor(), {}};
-  EXPECT_EQ(extensions_->consume("token", withoutFolder), nullptr);
+  EXPECT_EQ(extensions_->consume("token", std::move(withoutFolder)), nullptr);
 }
 
 TEST_F(FileExtensionTest, WhatIsNoRegularFileIsNotReadable) {
@@ -317,7 +307,7 @@ TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnce) {
     const std::string path = folder_.write("f" + std::to_string(++files), text);
     std::optional<FileExtension> given =
         FileExtension{ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC)), folder(), {user, 0, {}}};
-    return limited.consume("token", given);
+    return limited.consume("token", std::move(given));
   };
   const auto refused = [](FileAccess& file) {
     const auto read = file.readWhole(kPlenty);
@@ -344,7 +334,7 @@ TEST_F(FileExtensionTest, OneUsersFilesTakeSoMuchMemoryAtOnce) {
 TEST_F(FileExtensionTest, WithoutABrokerNothingIsRemovedAndItIsCounted) {
   LinuxFileExtensions alone(nullptr, log_, counters_, budget_);
   auto given = extension(::open(folder_.write("a", "1").c_str(), O_RDONLY | O_CLOEXEC));
-  const auto file = alone.consume("token", given);
+  const auto file = alone.consume("token", std::move(given));
   ASSERT_NE(file, nullptr);
   EXPECT_EQ(contents(*file), "1");
   EXPECT_FALSE(file->remove("a"));
