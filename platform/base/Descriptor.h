@@ -20,6 +20,7 @@ class Descriptor {
     if (fd_ >= 0 && closer_ != nullptr) closer_(fd_);
   }
   [[nodiscard]] int get() const { return fd_; }
+  explicit operator bool() const { return fd_ >= 0; }
   [[nodiscard]] int release() { return std::exchange(fd_, -1); }
 
  private:

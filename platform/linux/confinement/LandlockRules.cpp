@@ -65,7 +65,7 @@ std::string failed(const std::string& what, int error) {
 }
 
 std::optional<std::string> allow(int ruleset, const std::string& path, uint64_t rights, bool mayBeMissing) {
-  const FileHandle place(::open(path.c_str(), O_PATH | O_CLOEXEC));
+  const Descriptor place = ownDescriptor(::open(path.c_str(), O_PATH | O_CLOEXEC));
   if (!place) {
     if (mayBeMissing && (errno == ENOENT || errno == ENOTDIR || errno == EACCES)) return std::nullopt;
     return failed(path, errno);
@@ -91,7 +91,7 @@ std::variant<LandlockRules, std::string> LandlockRules::of(const ConfinementProf
       known, kBindTCP, kScopeSignals | (options.abstractSockets ? 0 : kScopeAbstractSockets)};
   LandlockRules rules;
   rules.missing_ = unknownTo(version);
-  rules.ruleset_ = FileHandle(
+  rules.ruleset_ = ownDescriptor(
       static_cast<int>(::syscall(SYS_landlock_create_ruleset, &attributes, sizeOfAttributes(version), 0)));
   if (!rules.ruleset_) return failed("landlock_create_ruleset", errno);
   const struct {

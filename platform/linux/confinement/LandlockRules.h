@@ -35,7 +35,7 @@ class LandlockRules {
   [[nodiscard]] const std::vector<std::string>& missing() const { return missing_; }
 
  private:
-  FileHandle ruleset_;
+  Descriptor ruleset_;
   std::vector<std::string> missing_;
 };
 

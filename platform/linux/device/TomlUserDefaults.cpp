@@ -139,9 +139,10 @@ bool TomlUserDefaults::lockWithinPatience(const std::string& domain, int file) {
   return true;
 }
 
-std::variant<FileHandle, Error> TomlUserDefaults::lockDomain(const std::string& domain) {
+std::variant<Descriptor, Error> TomlUserDefaults::lockDomain(const std::string& domain) {
   const std::string name = path(domain, ".lock");
-  FileHandle file(::open(name.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
+  Descriptor file =
+      ownDescriptor(::open(name.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
   if (!file) return systemFailure(errno, name);
   struct stat status = {}, folder = {};
   if (::fstat(file.get(), &status) == 0 && ::stat(options_.folder.c_str(), &folder) == 0 &&
@@ -224,10 +225,12 @@ std::optional<Error> TomlUserDefaults::replaceFile(const std::string& domain, st
   } else if (::stat(options_.folder.c_str(), &status) != 0) {
     return systemFailure(errno, options_.folder);
   }
-  const FileHandle folder(::open(options_.folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const Descriptor folder =
+      ownDescriptor(::open(options_.folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!folder) return systemFailure(errno, options_.folder);
 
-  const FileHandle out(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+  const Descriptor out =
+      ownDescriptor(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (!out) return systemFailure(errno, temporary);
   reached("created");
   adoptOwner(out.get(), status.st_uid, status.st_gid);

@@ -69,7 +69,7 @@ class TomlUserDefaults final : public UserDefaults {
                                                       std::optional<uint32_t> owner) const;
   std::optional<Error> replaceFile(const std::string& domain, std::string_view text) REQUIRES(writing_);
   const FlatToml& current(std::string_view domain) REQUIRES(mutex_);
-  std::variant<FileHandle, Error> lockDomain(const std::string& domain) REQUIRES(writing_);
+  std::variant<Descriptor, Error> lockDomain(const std::string& domain) REQUIRES(writing_);
   [[nodiscard]] bool lockWithinPatience(const std::string& domain, int file) REQUIRES(writing_);
   [[nodiscard]] std::string path(std::string_view domain, std::string_view suffix) const;
   void reached(const char* step) const {

@@ -10,10 +10,6 @@
 
 namespace kyt {
 
-FileHandle::~FileHandle() {
-  if (fd_ >= 0) ::close(fd_);
-}
-
 std::string errorText(int error) {
   return std::generic_category().message(error);
 }
@@ -74,7 +70,7 @@ bool isMomentary(int error) {
 
 std::variant<FileContents, ReadProblem> readRegularFile(const std::string& path, size_t maxBytes) {
   // Without O_NONBLOCK a named pipe in the file's place would hold the caller for ever.
-  const FileHandle file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  const Descriptor file = ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!file) return systemProblem(errno);
   struct stat status = {};
   if (::fstat(file.get(), &status) != 0) return systemProblem(errno);

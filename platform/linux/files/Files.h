@@ -1,4 +1,4 @@
-// Small files read whole, and the handle of a descriptor. For configuration, user defaults and bundles: a few
+// Small files read whole. For configuration, user defaults and bundles: a few
 // KiB each.
 #pragma once
 
@@ -9,28 +9,11 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <utility>
 #include <variant>
 
+#include "platform/linux/base/Descriptors.h"
+
 namespace kyt {
-
-class FileHandle {
- public:
-  FileHandle() = default;
-  explicit FileHandle(int fd) : fd_(fd) {}
-  FileHandle(FileHandle&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
-  FileHandle& operator=(FileHandle&& other) noexcept {
-    std::swap(fd_, other.fd_);
-    return *this;
-  }
-  ~FileHandle();
-  [[nodiscard]] int get() const { return fd_; }
-  [[nodiscard]] int release() { return std::exchange(fd_, -1); }
-  explicit operator bool() const { return fd_ >= 0; }
-
- private:
-  int fd_ = -1;
-};
 
 // What tells one state of a file from another without reading it.
 struct FileIdentity {

@@ -67,14 +67,14 @@ std::optional<Error> LinuxFileManager::createDirectory(const std::string& path) 
 }
 
 std::optional<Error> LinuxFileManager::createFile(const std::string& path) {
-  const FileHandle file(
+  const Descriptor file = ownDescriptor(
       ::open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, kFileMode));
   if (!file) return fileError(errno);
   return std::nullopt;
 }
 
 std::optional<Error> LinuxFileManager::append(const std::string& path, std::string_view bytes) {
-  const FileHandle file(
+  const Descriptor file = ownDescriptor(
       ::open(path.c_str(), O_WRONLY | O_APPEND | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
   if (!file) return fileError(errno);
   struct stat status = {};

@@ -82,12 +82,12 @@ bool isSame(const struct stat& one, const struct stat& other) {
 int refusalOf(int folder, std::span<const FolderIdentity> daemonsOwn) {
   if (daemonsOwn.empty()) return 0;
   struct stat status = {}, above = {};
-  FileHandle place(::openat(folder, ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  Descriptor place = ownDescriptor(::openat(folder, ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
   if (!place || ::fstat(place.get(), &status) != 0) return errno;
   for (size_t depth = 0; depth < kDeepestFolder; ++depth) {
     for (const FolderIdentity& own : daemonsOwn)
       if (own.device == status.st_dev && own.inode == status.st_ino) return EPERM;
-    FileHandle next(::openat(place.get(), "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    Descriptor next = ownDescriptor(::openat(place.get(), "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (!next || ::fstat(next.get(), &above) != 0) return errno;
     if (isSame(status, above)) return 0;
     place = std::move(next);
@@ -294,9 +294,9 @@ int DeletionBroker::remove(int file, int folder, std::string_view name, const Pe
   const BlockingScope blocking;
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) return errno;
-  const FileHandle mine(ends[0]);
+  const Descriptor mine = ownDescriptor(ends[0]);
   {
-    const FileHandle theirs(ends[1]);
+    const Descriptor theirs = ownDescriptor(ends[1]);
     if (!sendRequest(process_->socket(), *request, {file, folder, theirs.get()}))
       return errno != 0 ? errno : EIO;
   }

@@ -32,7 +32,7 @@ std::variant<std::unique_ptr<HelperProcess>, std::string> HelperProcess::start(
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0)
     return "socketpair: " + errorText(errno);
-  FileHandle mine(ends[0]), theirs(ends[1]);
+  Descriptor mine = ownDescriptor(ends[0]), theirs = ownDescriptor(ends[1]);
   const pid_t child = ::fork();
   if (child < 0) return "fork: " + errorText(errno);
   if (child == 0) {
@@ -47,7 +47,7 @@ std::variant<std::unique_ptr<HelperProcess>, std::string> HelperProcess::start(
 }
 
 HelperProcess::~HelperProcess() {
-  { const FileHandle closed = std::move(socket_); }
+  { const Descriptor closed = std::move(socket_); }
   // Somebody may have stopped it, and the confined daemon cannot end it.
   constexpr int kLooks = 400;  // four seconds
   constexpr timespec kPause = {0, 10'000'000};

@@ -28,9 +28,9 @@ class HelperProcess {
   [[nodiscard]] int socket() const { return socket_.get(); }
 
  private:
-  HelperProcess(FileHandle socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
+  HelperProcess(Descriptor socket, int32_t child) : socket_(std::move(socket)), child_(child) {}
 
-  FileHandle socket_;
+  Descriptor socket_;
   const int32_t child_;
 };
 

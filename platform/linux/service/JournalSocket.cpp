@@ -22,7 +22,7 @@ bool JournalSocket::isThere() {
 }
 
 std::shared_ptr<JournalSocket> JournalSocket::open() {
-  FileHandle socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   if (!socket) return nullptr;
   std::shared_ptr<JournalSocket> journal(new JournalSocket(std::move(socket)));
   return journal->connectAgain() ? journal : nullptr;
@@ -36,7 +36,7 @@ bool JournalSocket::connectAgain() {
 }
 
 bool JournalSocket::sendInFile(std::string_view entry) {
-  const FileHandle file(::memfd_create("journal-entry", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  const Descriptor file = ownDescriptor(::memfd_create("journal-entry", MFD_CLOEXEC | MFD_ALLOW_SEALING));
   // The journal takes no file that could still change.
   constexpr int kSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL;
   if (!file || !writeAll(file.get(), entry) || ::fcntl(file.get(), F_ADD_SEALS, kSeals) != 0) return false;

@@ -24,8 +24,8 @@ class JournalSocket {
   [[nodiscard]] bool sendInFile(std::string_view entry);
 
  private:
-  explicit JournalSocket(FileHandle socket) : socket_(std::move(socket)) {}
-  const FileHandle socket_;
+  explicit JournalSocket(Descriptor socket) : socket_(std::move(socket)) {}
+  const Descriptor socket_;
 };
 
 }  // namespace kyt

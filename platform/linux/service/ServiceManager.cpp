@@ -47,7 +47,7 @@ int tell(const std::string& state) {
   sockaddr_un address;
   socklen_t size = 0;
   if (!fillNotifyAddress(place, address, size)) return EINVAL;
-  const FileHandle socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  const Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   if (!socket || ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience) != 0)
     return errno;
   const auto* const to = reinterpret_cast<const sockaddr*>(&address);

@@ -28,7 +28,7 @@ long landlockVersion() {
 
 // 0, or errno of opening.
 int openError(const std::string& path, int flags) {
-  const FileHandle file(::open(path.c_str(), flags | O_CLOEXEC, 0600));
+  const Descriptor file = ownDescriptor(::open(path.c_str(), flags | O_CLOEXEC, 0600));
   return file ? 0 : errno;
 }
 
@@ -144,7 +144,7 @@ TEST_F(LandlockRulesTest, HoldsForThreadsThatStartLater) {
 
 TEST_F(LandlockRulesTest, ConnectsToAnyTCPPortAndBindsNone) {
   if (landlockVersion() < 4) GTEST_SKIP() << "this kernel's Landlock does not know TCP";
-  const FileHandle server(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const Descriptor server = ownDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
   sockaddr_in address = {};
   address.sin_family = AF_INET;
   address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
@@ -154,10 +154,10 @@ TEST_F(LandlockRulesTest, ConnectsToAnyTCPPortAndBindsNone) {
   ASSERT_EQ(::getsockname(server.get(), reinterpret_cast<sockaddr*>(&address), &size), 0);
   EXPECT_EQ(
       confined([&] {
-        const FileHandle client(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        const Descriptor client = ownDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
         const int connected =
             errorOf(::connect(client.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address));
-        const FileHandle other(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        const Descriptor other = ownDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
         sockaddr_in any = address;
         any.sin_port = 0;
         const int bound = errorOf(::bind(other.get(), reinterpret_cast<const sockaddr*>(&any), sizeof any));

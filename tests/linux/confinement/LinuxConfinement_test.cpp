@@ -42,7 +42,7 @@ long landlockVersion() {
 
 // 0, or errno of opening.
 int openError(const std::string& path, int flags) {
-  const FileHandle file(::open(path.c_str(), flags | O_CLOEXEC, 0600));
+  const Descriptor file = ownDescriptor(::open(path.c_str(), flags | O_CLOEXEC, 0600));
   return file ? 0 : errno;
 }
 
@@ -52,7 +52,7 @@ int errorOf(long result) {
 
 // 0, or errno of binding a Unix socket there.
 int makeSocket(const std::string& path) {
-  const FileHandle socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
   sockaddr_un address = {};
   address.sun_family = AF_UNIX;
   path.copy(address.sun_path, sizeof address.sun_path - 1);
@@ -195,7 +195,7 @@ TEST_F(LinuxConfinementTest, WhatOnlyTheStartNeedsIsRefusedAfterIt) {
   EXPECT_EQ(inChildProcess([&]() -> std::string {
               LinuxConfinement confinement = shipped();
               if (auto error = confinement.enter(kProfile)) return *error;
-              const FileHandle socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+              const Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
               sockaddr_un address = {};
               address.sun_family = AF_UNIX;
               (folder_ / "run/socket").copy(address.sun_path, sizeof address.sun_path - 1);
@@ -263,11 +263,11 @@ TEST_F(LinuxConfinementTest, TheShippedProfileLetsLibrariesDoWhatTheyRarelyDo) {
               wrong += library.problem().value_or("");
               for (const int family : {AF_INET, AF_INET6}) {
                 for (const int type : {SOCK_STREAM, SOCK_DGRAM}) {
-                  const FileHandle socket(::socket(family, type | SOCK_CLOEXEC, 0));
+                  const Descriptor socket = ownDescriptor(::socket(family, type | SOCK_CLOEXEC, 0));
                   if (!socket && errno != EAFNOSUPPORT) wrong += expectError("socket", errno, 0);
                 }
               }
-              const FileHandle routes(::socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, 0));
+              const Descriptor routes = ownDescriptor(::socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, 0));
               wrong += expectError("netlink", routes ? 0 : errno, 0);
               const timespec moment = {0, 1};
               wrong += expectError("nanosleep", errorOf(::nanosleep(&moment, nullptr)), 0);
@@ -311,7 +311,7 @@ class ConfinementAttemptTest : public LinuxConfinementTest {
                                const std::function<void()>& meanwhile = {}) {
     TemporaryFolder folder;
     lay(folder);
-    const FileHandle abstract(openAbstractSocketForAttempts(folder.path().c_str()));
+    const Descriptor abstract = ownDescriptor(openAbstractSocketForAttempts(folder.path().c_str()));
     if (!abstract) return "no abstract socket";
     return inChildProcess(
         [&]() -> std::string {
@@ -414,7 +414,7 @@ TEST_F(ConfinementAttemptTest, StandInTheDocumentWithTheirResults) {
 
 // The attempts are real ones: what a file's owner and root may do is not refused outside the confinement.
 TEST_F(LinuxConfinementTest, WithoutItManyAttemptsSucceed) {
-  const FileHandle abstract(openAbstractSocketForAttempts(folder_.path().c_str()));
+  const Descriptor abstract = ownDescriptor(openAbstractSocketForAttempts(folder_.path().c_str()));
   const auto outcome = [this](const char* name) {
     for (size_t i = 0; i < kAttemptCount; ++i) {
       if (std::string_view(kAttempts[i].name) != name) continue;

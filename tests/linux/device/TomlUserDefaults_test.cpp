@@ -288,7 +288,8 @@ TEST_F(TomlUserDefaultsTest, RefusesAnIdentifierWithAVeryLongName) {
 
 TEST_F(TomlUserDefaultsTest, GivesUpWhenTheLockIsHeldForTooLong) {
   folder_.write("com.vantu.kytreporting.lock", "");
-  const FileHandle held(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
+  const Descriptor held =
+      ownDescriptor(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
   ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
   auto defaults = make(std::chrono::milliseconds(20));
   EXPECT_NE(defaults.set(kDomain, "a", Value(1)), std::nullopt);
@@ -304,7 +305,8 @@ TEST_F(TomlUserDefaultsTest, GivesUpWhenTheLockIsHeldForTooLong) {
 TEST_F(TomlUserDefaultsTest, ALockThatSomebodyKeepsIsWaitedForOnceByAllAndHoldsUpNobodyElse) {
   constexpr int kWriters = 12;
   folder_.write("com.vantu.kytreporting.lock", "");
-  const FileHandle held(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
+  const Descriptor held =
+      ownDescriptor(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
   ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
   auto defaults = make(std::chrono::seconds(2));
   WorkerPoolOptions options;

@@ -62,13 +62,13 @@ std::string statusOf(pid_t process, const std::string& key) {
 class Broker : public testing::Test {
  protected:
   struct Opened {
-    FileHandle file, folder;
+    Descriptor file, folder;
   };
-  FileHandle folder() const {
-    return FileHandle(::open(folder_.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  Descriptor folder() const {
+    return ownDescriptor(::open(folder_.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
   }
   Opened open(const std::string& name) const {
-    return {FileHandle(::open((folder_ / name).c_str(), O_RDONLY | O_CLOEXEC)), folder()};
+    return {ownDescriptor(::open((folder_ / name).c_str(), O_RDONLY | O_CLOEXEC)), folder()};
   }
   int remove(const Opened& opened, std::string_view name, const PeerIdentity& peer = myself()) const {
     return broker_->remove(opened.file.get(), opened.folder.get(), name, peer);
@@ -113,7 +113,7 @@ TEST_F(Broker, TakesOnlyPlainNames) {
   folder_.write("a", "1");
   folder_.write("sub/b", "2");
   const Opened opened = open("a");
-  const Opened below = {FileHandle(::open((folder_ / "sub/b").c_str(), O_RDONLY | O_CLOEXEC)), folder()};
+  const Opened below = {ownDescriptor(::open((folder_ / "sub/b").c_str(), O_RDONLY | O_CLOEXEC)), folder()};
   EXPECT_EQ(remove(below, "sub/b"), EINVAL);
   EXPECT_EQ(remove(opened, "./a"), EINVAL);
   EXPECT_EQ(remove(opened, (folder_ / "a")), EINVAL);
@@ -129,7 +129,7 @@ TEST_F(Broker, RemovesNothingButRegularFiles) {
   std::filesystem::create_directory(folder_ / "folder");
   EXPECT_EQ(remove(open("folder"), "folder"), EINVAL);
   ASSERT_EQ(::mkfifo((folder_ / "fifo").c_str(), 0600), 0);
-  const Opened fifo = {FileHandle(::open((folder_ / "fifo").c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC)),
+  const Opened fifo = {ownDescriptor(::open((folder_ / "fifo").c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC)),
                        folder()};
   EXPECT_EQ(remove(fifo, "fifo"), EINVAL);
   EXPECT_TRUE(exists("fifo"));
@@ -249,7 +249,7 @@ class SilentFileSystem {
     const long listener =
         ::syscall(SYS_seccomp, SECCOMP_SET_MODE_FILTER, SECCOMP_FILTER_FLAG_NEW_LISTENER, &program);
     if (listener < 0) return "seccomp: " + errorText(errno);
-    listener_ = FileHandle(static_cast<int>(listener));
+    listener_ = ownDescriptor(static_cast<int>(listener));
     return {};
   }
   // The next process that stands still, and does so until it ends.
@@ -259,7 +259,7 @@ class SilentFileSystem {
   }
 
  private:
-  FileHandle listener_;
+  Descriptor listener_;
 };
 
 // Runs where removing hangs, and prints what went wrong. Three removals at once: one that hangs, one that hangs in
@@ -274,8 +274,9 @@ std::string removeWhereItHangs(const TemporaryFolder& folder) {
     double seconds = 0;
   };
   const auto remove = [&](const char* name, const char* opened, Removal& removal) {
-    const FileHandle file(::open((folder / opened).c_str(), O_RDONLY | O_CLOEXEC));
-    const FileHandle directory(::open(folder.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const Descriptor file = ownDescriptor(::open((folder / opened).c_str(), O_RDONLY | O_CLOEXEC));
+    const Descriptor directory =
+        ownDescriptor(::open(folder.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
     const auto begin = Clock::now();
     removal.result = broker->remove(file.get(), directory.get(), name, myself());
     removal.seconds = std::chrono::duration<double>(Clock::now() - begin).count();
@@ -322,8 +323,8 @@ std::string removeAtOnce(const TemporaryFolder& folder) {
   SilentFileSystem silent;
   if (const std::string problem = silent.begin(); !problem.empty()) return "cannot: " + problem;
   const auto broker = startBroker();
-  const FileHandle file(::open((folder / "a").c_str(), O_RDONLY | O_CLOEXEC));
-  const FileHandle directory(::open(folder.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  const Descriptor file = ownDescriptor(::open((folder / "a").c_str(), O_RDONLY | O_CLOEXEC));
+  const Descriptor directory = ownDescriptor(::open(folder.path().c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
   const auto remove = [&](const char* name, const PeerIdentity& peer) {
     return broker->remove(file.get(), directory.get(), name, peer);
   };
@@ -355,11 +356,11 @@ TEST_F(Broker, WorksForOneUserOnlySoOftenAtOnceAndForOthersMeanwhile) {
 TEST_F(Broker, LeavesAFileThatNobodyOpenedForReading) {
   folder_.write("a", "1");
   for (const int flags : {O_PATH, O_WRONLY, O_WRONLY | O_APPEND}) {
-    const Opened opened = {FileHandle(::open((folder_ / "a").c_str(), flags | O_CLOEXEC)), folder()};
+    const Opened opened = {ownDescriptor(::open((folder_ / "a").c_str(), flags | O_CLOEXEC)), folder()};
     EXPECT_EQ(remove(opened, "a"), EBADF) << flags;
   }
   EXPECT_TRUE(exists("a"));
-  const Opened both = {FileHandle(::open((folder_ / "a").c_str(), O_RDWR | O_CLOEXEC)), folder()};
+  const Opened both = {ownDescriptor(::open((folder_ / "a").c_str(), O_RDWR | O_CLOEXEC)), folder()};
   EXPECT_EQ(remove(both, "a"), 0);
 }
 
@@ -369,8 +370,10 @@ TEST_F(Broker, LeavesWhatLiesBeneathTheDaemonsOwnFoldersUnderWhateverName) {
   std::filesystem::create_directory_symlink(folder_ / "own", folder_ / "link");
   const auto broker = startBroker({folder_ / "missing", folder_ / "link", folder_ / "other/c"});
   const auto removeFrom = [&](const std::string& where, const std::string& name) {
-    const FileHandle directory(::open((folder_ / where).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    const FileHandle file(::open((folder_ / (where + "/" + name)).c_str(), O_RDONLY | O_CLOEXEC));
+    const Descriptor directory =
+        ownDescriptor(::open((folder_ / where).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const Descriptor file =
+        ownDescriptor(::open((folder_ / (where + "/" + name)).c_str(), O_RDONLY | O_CLOEXEC));
     return broker->remove(file.get(), directory.get(), name, myself());
   };
   EXPECT_EQ(removeFrom("own", "a"), EPERM);
@@ -424,9 +427,9 @@ class ForgedRequest : public Broker {
     const Opened opened = open("a");
     int ends[2] = {-1, -1};
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends), 0);
-    const FileHandle mine(ends[0]);
+    const Descriptor mine = ownDescriptor(ends[0]);
     {
-      const FileHandle theirs(ends[1]);
+      const Descriptor theirs = ownDescriptor(ends[1]);
       std::vector<int> descriptors = {opened.file.get(), opened.folder.get(), theirs.get()};
       descriptors.resize(descriptors.size() + more, opened.file.get());
       send(words, bytes, descriptors);
@@ -487,7 +490,7 @@ TEST_F(ForgedRequest, OfAnotherSizeOrWithAbsurdNumbersIsDroppedAndTheNextIsServe
 TEST_F(ForgedRequest, ThatComesInMassesIsServedInTurn) {
   folder_.write("b", "1");
   const Opened opened = open("b");
-  const FileHandle nowhere(::open("/dev/null", O_WRONLY | O_CLOEXEC));
+  const Descriptor nowhere = ownDescriptor(::open("/dev/null", O_WRONLY | O_CLOEXEC));
   for (int i = 0; i < 500; ++i)
     send({}, sizeof(Words), {opened.file.get(), opened.folder.get(), nowhere.get()});
   EXPECT_TRUE(eventually([&] { return ask({}) == 0; }));

@@ -23,15 +23,15 @@ struct Pipe {
   Pipe() {
     int ends[2];
     EXPECT_EQ(::pipe2(ends, O_CLOEXEC | O_DIRECT), 0);
-    in = FileHandle(ends[0]);
-    out = FileHandle(ends[1]);
+    in = ownDescriptor(ends[0]);
+    out = ownDescriptor(ends[1]);
   }
   std::string next() const {
     char buffer[4096];
     const ssize_t count = ::read(in.get(), buffer, sizeof buffer);
     return count > 0 ? std::string(buffer, static_cast<size_t>(count)) : std::string();
   }
-  FileHandle in, out;
+  Descriptor in, out;
 };
 
 TEST(StderrSink, WritesEachLineAtOnceWithItsLevelInFront) {
@@ -78,8 +78,8 @@ struct FullPipe {
   FullPipe() {
     int ends[2];
     EXPECT_EQ(::pipe2(ends, O_CLOEXEC | O_NONBLOCK), 0);
-    in = FileHandle(ends[0]);
-    out = FileHandle(ends[1]);
+    in = ownDescriptor(ends[0]);
+    out = ownDescriptor(ends[1]);
     while (::write(out.get(), "-", 1) == 1) {
     }
     EXPECT_EQ(::fcntl(out.get(), F_SETFL, 0), 0);
@@ -98,7 +98,7 @@ struct FullPipe {
     all.erase(0, all.find_first_not_of('-'));
     return all;
   }
-  FileHandle in, out;
+  Descriptor in, out;
 };
 
 TEST(PatientStderrSink, WritesAtOnceWhatHasRoom) {

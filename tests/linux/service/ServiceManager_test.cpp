@@ -32,7 +32,7 @@ TEST(ServiceManager, TellsItsStateWhenSomeoneListens) {
   EXPECT_EQ(inChildProcess([&]() -> std::string {
               ::unsetenv("NOTIFY_SOCKET");
               ServiceManager::ready("nobody listens");
-              const FileHandle socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+              const Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
               const sockaddr_un address = addressOf(folder / "notify");
               if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
                 return "bind";
