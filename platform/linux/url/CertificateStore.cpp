@@ -16,6 +16,8 @@
 #include <string_view>
 #include <utility>
 
+#include "platform/linux/base/Descriptors.h"
+
 namespace kyt {
 namespace {
 
@@ -46,17 +48,16 @@ std::vector<std::string> systemPlaces() {
 // The whole of a file, or nothing when it cannot be read now.
 std::optional<std::string> contentsOf(const std::string& path) {
   // Without O_NONBLOCK a named pipe in the file's place would hold the network thread for ever.
-  const int descriptor = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
-  if (descriptor < 0) return std::nullopt;
+  const Descriptor file = ownDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  if (file.get() < 0) return std::nullopt;
   std::string contents;
   struct stat status = {};
-  ssize_t count = ::fstat(descriptor, &status) == 0 && S_ISREG(status.st_mode) ? 1 : -1;
+  ssize_t count = ::fstat(file.get(), &status) == 0 && S_ISREG(status.st_mode) ? 1 : -1;
   while (count > 0) {
     char bytes[16384];
-    count = ::read(descriptor, bytes, sizeof bytes);
+    count = ::read(file.get(), bytes, sizeof bytes);
     if (count > 0) contents.append(bytes, static_cast<size_t>(count));
   }
-  ::close(descriptor);
   return count == 0 ? std::optional(std::move(contents)) : std::nullopt;
 }
 

@@ -12,26 +12,32 @@
 struct ssl_ctx_st;
 struct x509_store_st;
 
+// The one table of libcurl's functions: what each is called here, and there.
+#define KYT_CURL_FUNCTIONS(ROW)              \
+  ROW(globalInit, curl_global_init)          \
+  ROW(globalCleanup, curl_global_cleanup)    \
+  ROW(easyInit, curl_easy_init)              \
+  ROW(easyCleanup, curl_easy_cleanup)        \
+  ROW(easySetOption, curl_easy_setopt)       \
+  ROW(easyGetInfo, curl_easy_getinfo)        \
+  ROW(easyErrorText, curl_easy_strerror)     \
+  ROW(multiInit, curl_multi_init)            \
+  ROW(multiCleanup, curl_multi_cleanup)      \
+  ROW(multiSetOption, curl_multi_setopt)     \
+  ROW(multiAdd, curl_multi_add_handle)       \
+  ROW(multiRemove, curl_multi_remove_handle) \
+  ROW(multiReadInfo, curl_multi_info_read)   \
+  ROW(multiSocketAction, curl_multi_socket_action)
+
 namespace kyt {
 
 struct CurlLibrary {
   // Loads and initialises it, or says why that failed.
   [[nodiscard]] static std::variant<CurlLibrary, std::string> load(const char* name);
 
-  decltype(::curl_global_init)* globalInit = nullptr;
-  decltype(::curl_global_cleanup)* globalCleanup = nullptr;
-  decltype(::curl_easy_init)* easyInit = nullptr;
-  decltype(::curl_easy_cleanup)* easyCleanup = nullptr;
-  decltype(::curl_easy_setopt)* easySetOption = nullptr;
-  decltype(::curl_easy_getinfo)* easyGetInfo = nullptr;
-  decltype(::curl_easy_strerror)* easyErrorText = nullptr;
-  decltype(::curl_multi_init)* multiInit = nullptr;
-  decltype(::curl_multi_cleanup)* multiCleanup = nullptr;
-  decltype(::curl_multi_setopt)* multiSetOption = nullptr;
-  decltype(::curl_multi_add_handle)* multiAdd = nullptr;
-  decltype(::curl_multi_remove_handle)* multiRemove = nullptr;
-  decltype(::curl_multi_info_read)* multiReadInfo = nullptr;
-  decltype(::curl_multi_socket_action)* multiSocketAction = nullptr;
+#define ROW(here, there) decltype(::there)* here = nullptr;
+  KYT_CURL_FUNCTIONS(ROW)
+#undef ROW
   void (*setCertificateStore)(ssl_ctx_st*, x509_store_st*) = nullptr;
 };
 

@@ -3,25 +3,24 @@
 // Network thread only.
 #pragma once
 
+#include "platform/base/Descriptor.h"
+
 namespace kyt {
 
 class RouteEvents {
  public:
-  RouteEvents() = default;
-  ~RouteEvents() { unsubscribe(); }
-  RouteEvents(const RouteEvents&) = delete;
-  RouteEvents& operator=(const RouteEvents&) = delete;
-
   // Whether there is a subscription now. Without one (no descriptors, a confinement that forbids it) the slow
   // timer is all that wakes what waits, and each request looks at its session's connections.
   bool subscribe();
-  void unsubscribe();
-  [[nodiscard]] int descriptor() const { return socket_; }  // readable after an event; -1: not subscribed
+  void unsubscribe() { socket_ = {}; }
+  [[nodiscard]] int descriptor() const {
+    return socket_.get();
+  }  // readable after an event; -1: not subscribed
   // Forgets the events that came; whether there were any.
   [[nodiscard]] bool takeAll();
 
  private:
-  int socket_ = -1;
+  Descriptor socket_;
 };
 
 }  // namespace kyt

@@ -7,12 +7,13 @@
 #include <net/if.h>
 #include <netinet/in.h>
 #include <sys/ioctl.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <fstream>
 #include <memory>
+
+#include "platform/linux/base/Descriptors.h"
 
 namespace kyt {
 namespace {
@@ -96,15 +97,10 @@ RouteTable::RouteTable(std::vector<std::string> cellularInterfaces, std::string 
       sysClassNet_(std::move(sysClassNet)),
       resolverFile_(std::move(resolverFile)) {}
 
-RouteTable::~RouteTable() {
-  if (socket_ >= 0) close(socket_);
-  if (flagsSocket_ >= 0) close(flagsSocket_);
-}
-
 std::optional<int> RouteTable::lookUp(const sockaddr& address, int through, sockaddr_storage* source) {
   if (address.sa_family != AF_INET && address.sa_family != AF_INET6) return 0;
-  if (socket_ < 0) socket_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE);
-  if (socket_ < 0) return 0;
+  if (socket_.get() < 0) socket_ = ownDescriptor(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE));
+  if (socket_.get() < 0) return 0;
 
   RouteQuestion question{};
   question.header.nlmsg_len = NLMSG_LENGTH(sizeof(rtmsg));
@@ -127,11 +123,11 @@ std::optional<int> RouteTable::lookUp(const sockaddr& address, int through, sock
     question.route.rtm_flags = RTM_F_FIB_MATCH;
     question.add(RTA_OIF, &through, sizeof through);
   }
-  if (send(socket_, &question, question.header.nlmsg_len, 0) < 0) return 0;
+  if (send(socket_.get(), &question, question.header.nlmsg_len, 0) < 0) return 0;
 
   alignas(nlmsghdr) char answer[4096];
   for (;;) {
-    const ssize_t size = recv(socket_, answer, sizeof answer, 0);
+    const ssize_t size = recv(socket_.get(), answer, sizeof answer, 0);
     if (size < 0) {
       if (errno == EINTR) continue;
       return 0;
@@ -148,11 +144,11 @@ std::optional<int> RouteTable::usableRoute(const sockaddr& address, int through,
 }
 
 bool RouteTable::hasCarrier(int interface) {
-  if (flagsSocket_ < 0) flagsSocket_ = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  if (flagsSocket_.get() < 0) flagsSocket_ = ownDescriptor(socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   ifreq question{};
   const std::string name = nameOf(interface);
   name.copy(question.ifr_name, sizeof question.ifr_name - 1);
-  if (name.empty() || ioctl(flagsSocket_, SIOCGIFFLAGS, &question) != 0) return true;
+  if (name.empty() || ioctl(flagsSocket_.get(), SIOCGIFFLAGS, &question) != 0) return true;
   return (question.ifr_flags & IFF_RUNNING) != 0;
 }
 

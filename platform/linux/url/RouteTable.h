@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/Descriptor.h"
+
 namespace kyt {
 
 class RouteTable {
@@ -21,9 +23,6 @@ class RouteTable {
   // `cellularInterfaces`: shell patterns of interface names. `sysClassNet`: where the kernel describes
   // interfaces.
   RouteTable(std::vector<std::string> cellularInterfaces, std::string sysClassNet, std::string resolverFile);
-  ~RouteTable();
-  RouteTable(const RouteTable&) = delete;
-  RouteTable& operator=(const RouteTable&) = delete;
 
   // Whether a packet to the address would leave now; with `avoidCellular`, whether it can over another
   // interface.
@@ -55,7 +54,7 @@ class RouteTable {
 
   std::vector<std::string> cellularInterfaces_;
   std::string sysClassNet_, resolverFile_;
-  int socket_ = -1, flagsSocket_ = -1;
+  Descriptor socket_, flagsSocket_;
   unsigned sequence_ = 0;
 };
 
