@@ -13,13 +13,14 @@ class CurlURLSession final : public URLSession {
   std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) override {
     const size_t charge = OutstandingBytes::of(request);
     OutstandingBytes::User& user = state_->outstanding.user(request.account);
-    const auto refusal = !user.take(charge) ? URLTransfer::Refusal::tooMuch : URLTransfer::Refusal::none;
-    // It is not kept until its completion has run.
-    if (refusal == URLTransfer::Refusal::tooMuch) request = {};
-    auto transfer = std::make_shared<URLTransfer>(state_, std::move(request), std::move(completion));
-    transfer->user = &user;
-    transfer->outstandingCharge = refusal == URLTransfer::Refusal::none ? charge : 0;
-    transfer->refusal = state_->invalidated.load() ? URLTransfer::Refusal::invalidated : refusal;
+    const bool hasRoom = user.take(charge);
+    if (!hasRoom) request = {};  // it is not kept until its completion has run
+    const auto refusal = state_->invalidated.load() ? URLTransfer::Refusal::invalidated
+                         : hasRoom                  ? URLTransfer::Refusal::none
+                                                    : URLTransfer::Refusal::tooMuch;
+    auto transfer =
+        std::make_shared<URLTransfer>(state_, user, std::move(request), std::move(completion), refusal);
+    transfer->outstandingCharge = hasRoom ? charge : 0;
     state_->used = true;
     state_->network->start(transfer);
     return transfer;

@@ -6,13 +6,13 @@
 #include <netinet/in.h>
 #include <poll.h>
 #include <sys/ioctl.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstddef>
 #include <cstring>
 
+#include "platform/linux/base/Descriptors.h"
 #include "platform/linux/url/URLTransfer.h"
 
 namespace kyt {
@@ -72,11 +72,9 @@ bool isUnspecified(const sockaddr_storage& address) {
 bool isHere(sockaddr_storage address) {
   if (address.ss_family == AF_INET) reinterpret_cast<sockaddr_in&>(address).sin_port = 0;
   if (address.ss_family == AF_INET6) reinterpret_cast<sockaddr_in6&>(address).sin6_port = 0;
-  const int probe = socket(address.ss_family, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-  if (probe < 0) return true;
-  const bool bound = bind(probe, &generic(address), sizeof address) == 0 || errno != EADDRNOTAVAIL;
-  close(probe);
-  return bound;
+  const Descriptor probe = ownDescriptor(socket(address.ss_family, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  if (probe.get() < 0) return true;
+  return bind(probe.get(), &generic(address), sizeof address) == 0 || errno != EADDRNOTAVAIL;
 }
 
 }  // namespace
@@ -171,7 +169,7 @@ void URLConnection::closing() {
   }
   isOver_ = true;
   const bool mayGoAgain = std::any_of(transfers.begin(), transfers.end(), [&](const URLTransfer* transfer) {
-    return hasAcknowledgedNothingBehind(transfer->mark);
+    return hasAcknowledgedNothingBehind(transfer->attempt.mark);
   });
   if (mayGoAgain) discard();
 }

@@ -5,7 +5,7 @@
 #include <unistd.h>
 
 #include "platform/base/Limits.h"
-#include "platform/linux/url/URLNetwork.h"
+#include "platform/linux/url/URLRequests.h"
 #include "platform/linux/url/URLSessionState.h"
 
 namespace kyt {
@@ -15,30 +15,31 @@ constexpr long kConnectionsPerServer = 8;
 constexpr size_t kKeptHandles = 2;  // each keeps its buffers
 
 CURLcode useCertificates(CURL*, void* context, void* connectionsOf) {
-  auto& network = *static_cast<URLNetwork*>(connectionsOf);
-  x509_store_st* store = network.certificates().store();
+  auto& tools = *static_cast<NetworkTools*>(connectionsOf);
+  x509_store_st* store = tools.certificates.store();
   if (store == nullptr) return CURLE_SSL_CACERT_BADFILE;
-  network.curl().setCertificateStore(static_cast<ssl_ctx_st*>(context), store);
+  tools.curl->setCertificateStore(static_cast<ssl_ctx_st*>(context), store);
   return CURLE_OK;
 }
 
 }  // namespace
 
-URLConnectionPool::URLConnectionPool(URLNetwork& network, URLSessionState& session, size_t number)
-    : network_(network),
+URLConnectionPool::URLConnectionPool(URLRequests& requests, NetworkTools& tools, URLSessionState& session,
+                                     size_t number)
+    : requests_(requests),
+      tools_(tools),
       session_(session),
       number_(number),
-      curl_(network.curl()),
+      curl_(*tools.curl),
       multi_(curl_.multiInit()),
       timer_(
-          network.deadlines(), [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); },
-          this),
+          tools.deadlines, [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); }, this),
       idle_(
-          network.deadlines(),
+          tools.deadlines,
           [](void* pool) {
             auto* idle = static_cast<URLConnectionPool*>(pool);
-            idle->network_.idlePools().remove(*idle);
-            idle->network_.closePool(idle->session_, idle->number_);
+            idle->requests_.pools().idle().remove(*idle);
+            idle->requests_.closePool(idle->session_, idle->number_);
           },
           this) {
   if (multi_ == nullptr) return;
@@ -70,7 +71,7 @@ CURL* URLConnectionPool::takeHandle() {
   const auto seconds = [](Duration duration) {
     return static_cast<long>(std::chrono::ceil<std::chrono::seconds>(duration).count());
   };
-  const CurlURLSessionOptions& options = network_.options();
+  const CurlURLSessionOptions& options = tools_.options;
   curl_.easySetOption(handle, CURLOPT_NOSIGNAL, 1L);
   curl_.easySetOption(handle, CURLOPT_NOPROGRESS, 0L);
   curl_.easySetOption(handle, CURLOPT_PROTOCOLS_STR, "http,https");
@@ -85,7 +86,7 @@ CURL* URLConnectionPool::takeHandle() {
   curl_.easySetOption(handle, CURLOPT_CAPATH, nullptr);
   curl_.easySetOption(handle, CURLOPT_CA_CACHE_TIMEOUT, 0L);  // nor one that libcurl remembers
   curl_.easySetOption(handle, CURLOPT_SSL_CTX_FUNCTION, useCertificates);
-  curl_.easySetOption(handle, CURLOPT_SSL_CTX_DATA, &network_);
+  curl_.easySetOption(handle, CURLOPT_SSL_CTX_DATA, &tools_);
   curl_.easySetOption(handle, CURLOPT_BUFFERSIZE, 4096L);  // replies are small, sessions many
   curl_.easySetOption(handle, CURLOPT_TCP_NODELAY, 1L);
   curl_.easySetOption(
@@ -102,7 +103,7 @@ CURL* URLConnectionPool::takeHandle() {
 // A TLS session that is taken up again is not verified again, so none is once authorities have changed.
 bool URLConnectionPool::mayResume(const URLTransfer& transfer) {
   if (strncasecmp(transfer.request.url.c_str(), "https:", 6) != 0) return true;
-  const unsigned generation = network_.certificates().generation();
+  const unsigned generation = tools_.certificates.generation();
   if (!certificates_) certificates_ = generation;
   return *certificates_ == generation;
 }
@@ -144,13 +145,13 @@ void URLConnectionPool::closeIfIdle() {
   if (active_ != 0 || isRetired_) return;
   leaveIdle();
   const bool now = session_.invalidated.load();
-  idle_.set(now ? network_.now() : network_.now() + network_.options().idleConnectionTime);
-  if (URLConnectionPool* surplus = network_.idlePools().add(*this)) surplus->idle_.set(network_.now());
+  idle_.set(now ? tools_.now : tools_.now + tools_.options.idleConnectionTime);
+  if (URLConnectionPool* surplus = requests_.pools().idle().add(*this)) surplus->idle_.set(tools_.now);
 }
 
 void URLConnectionPool::leaveIdle() {
   idle_.cancel();
-  network_.idlePools().remove(*this);
+  requests_.pools().idle().remove(*this);
 }
 
 void URLConnectionPool::retire() {
@@ -175,22 +176,22 @@ int URLConnectionPool::socketClosed(void* pool, curl_socket_t socket) {
   for (const auto& one : self.connections_)
     if (one->socket() == socket) one->closing();
   std::erase_if(self.connections_, [&](const auto& one) { return one->socket() == socket; });
-  self.network_.sockets().closed(socket);
+  self.tools_.sockets.closed(socket);
   return close(socket);
 }
 
-bool URLConnectionPool::judgeConnections() {
+bool URLConnectionPool::judgeConnections(uint64_t routes) {
   bool good = true;
-  routesWhenJudged = network_.routeChanges();
+  routesWhenJudged = routes;
   for (const auto& one : connections_) {
-    const RouteTable::Way way = one->way(network_.routes(), number_ == 1);
+    const RouteTable::Way way = one->way(tools_.routes, number_ == 1);
     good = good && way == RouteTable::Way::same;
     if (!one->isConnected()) continue;  // nothing has begun on it
     if (way != RouteTable::Way::none) {
       one->lostSince.reset();
     } else if (!one->lostSince) {
-      one->lostSince = network_.now();
-      for (URLTransfer* transfer : one->transfers) network_.connectionLost(*transfer);
+      one->lostSince = tools_.now;
+      for (URLTransfer* transfer : one->transfers) requests_.ends().connectionLost(*transfer);
     }
   }
   return good;
@@ -198,7 +199,7 @@ bool URLConnectionPool::judgeConnections() {
 
 int URLConnectionPool::socketChanged(CURL*, curl_socket_t socket, int what, void* pool, void*) {
   auto& self = *static_cast<URLConnectionPool*>(pool);
-  self.network_.sockets().watch(self, socket, what);
+  self.tools_.sockets.watch(self, socket, what);
   return 0;
 }
 
@@ -207,7 +208,7 @@ int URLConnectionPool::timerChanged(CURLM*, long milliseconds, void* pool) {
   if (milliseconds < 0) {
     self.timer_.cancel();
   } else {
-    self.timer_.set(self.network_.now() + std::chrono::milliseconds(milliseconds));
+    self.timer_.set(self.tools_.now + std::chrono::milliseconds(milliseconds));
   }
   return 0;
 }
@@ -234,7 +235,7 @@ void URLConnectionPool::finishEnded() {
     URLTransfer* transfer = nullptr;
     const CURLcode code = message->data.result;
     curl_.easyGetInfo(message->easy_handle, CURLINFO_PRIVATE, &transfer);
-    network_.transferEnded(*transfer, code);
+    requests_.ends().attemptEnded(*transfer, code);
   }
 }
 

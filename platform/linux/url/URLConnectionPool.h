@@ -18,13 +18,14 @@
 
 namespace kyt {
 
-class URLNetwork;
+class URLRequests;
 class URLTransfer;
+struct NetworkTools;
 struct URLSessionState;
 
 class URLConnectionPool {
  public:
-  URLConnectionPool(URLNetwork& network, URLSessionState& session, size_t number);
+  URLConnectionPool(URLRequests& requests, NetworkTools& tools, URLSessionState& session, size_t number);
   ~URLConnectionPool();  // precondition: no transfer is in it
   URLConnectionPool(const URLConnectionPool&) = delete;
   URLConnectionPool& operator=(const URLConnectionPool&) = delete;
@@ -38,8 +39,8 @@ class URLConnectionPool {
   [[nodiscard]] std::shared_ptr<URLConnection> connectionBetween(const char* local, int localPort,
                                                                  const char* peer, int peerPort);
   // Looks where its connections lead. Whether a new request may go on any of them: none would leave otherwise when
-  // it were made now.
-  [[nodiscard]] bool judgeConnections();
+  // it were made now. `routes`: the number of their last change.
+  [[nodiscard]] bool judgeConnections(uint64_t routes);
   // No new request: it ends with its last one. Its owner is the network from then on, which takes those out of it
   // that have not begun.
   void retire();
@@ -63,7 +64,8 @@ class URLConnectionPool {
   void timerExpired();
   void finishEnded();
 
-  URLNetwork& network_;
+  URLRequests& requests_;
+  NetworkTools& tools_;
   URLSessionState& session_;
   const size_t number_;  // in the session
   const CurlLibrary& curl_;

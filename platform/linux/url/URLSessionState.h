@@ -11,20 +11,12 @@
 #include "platform/linux/url/LinkedList.h"
 #include "platform/linux/url/URLConnectionPool.h"
 #include "platform/linux/url/URLTransfer.h"
+#include "platform/linux/url/WaitingRequests.h"
 #include "platform/queues/SerialQueue.h"
 
 namespace kyt {
 
 class URLNetwork;
-
-// One user's requests that wait for connectivity, oldest first, and what they count towards the limit.
-struct WaitingRequests {
-  struct WaitingLinks {
-    static Links<URLTransfer>& of(URLTransfer& transfer) { return transfer.waitingLinks; }
-  };
-  LinkedList<URLTransfer, WaitingLinks> transfers;
-  size_t bytes = 0;
-};
 
 struct URLSessionState {
   URLSessionState(std::shared_ptr<URLNetwork> owner, URLSessionConfiguration wanted)
@@ -43,8 +35,8 @@ struct URLSessionState {
   std::shared_ptr<URLSessionState> self;  // while listed: connections end on the network thread alone
   Links<URLSessionState> links;           // among the sessions that have requests or connections
   LinkedList<URLTransfer> transfers;      // not yet completed, in the order in which they were started
-  std::map<const OutstandingBytes::User*, WaitingRequests> waiting;  // those of them that wait, by user
-  std::shared_ptr<SerialQueue> queue;  // runs completions; made for the first one
+  std::map<const OutstandingBytes::User*, WaitingLine> waiting;  // those of them that wait, by user
+  std::shared_ptr<SerialQueue> queue;                            // runs completions; made for the first one
   // Connections that may use cellular interfaces, and those that may not: never shared.
   std::unique_ptr<URLConnectionPool> pools[2];
 };

@@ -5,7 +5,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <cstring>
 #include <utility>
 
@@ -16,56 +15,26 @@
 namespace kyt {
 namespace {
 
-constexpr size_t kMaxReplyHeaderBytes = 256u << 10;
 constexpr size_t kMaxAddresses = 16;          // of one server that are remembered
 constexpr uint8_t kMaxEndedConnections = 32;  // a session keeps eight to a server
 
-bool isControl(char c) {
-  return static_cast<unsigned char>(c) < 0x20 || c == 0x7f;
-}
-
-bool sameName(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
-}
-
-std::string_view trim(std::string_view text) {
-  const size_t first = text.find_first_not_of(" \t\r\n");
-  if (first == std::string_view::npos) return {};
-  return text.substr(first, text.find_last_not_of(" \t\r\n") - first + 1);
-}
-
-std::string withoutControls(std::string_view text) {
-  std::string result(text);
-  std::erase_if(result, isControl);
-  return result;
-}
-
-// Of a line as in "HTTP/1.1 200 OK"; 0 of one that is only preliminary.
-int statusOf(std::string_view line) {
-  int status = 0;
-  line.remove_prefix(std::min(line.find(' '), line.size()));
-  line.remove_prefix(std::min(line.find_first_not_of(' '), line.size()));
-  (void)std::from_chars(line.data(), line.data() + line.size(), status);
-  return status >= 200 ? status : 0;
-}
-
 }  // namespace
 
-URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, URLRequest wanted, URLCompletion completion)
+URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, OutstandingBytes::User& itsUser,
+                         URLRequest wanted, URLCompletion completion, Refusal refused)
     : session(std::move(state)),
+      user(itsUser),
+      refusal(refused),
       request(std::move(wanted)),
       deadline(
-          session->network->deadlines(),
+          session->network->tools().deadlines,
           [](void* transfer) {
             auto* expired = static_cast<URLTransfer*>(transfer);
-            expired->session->network->transferDeadline(*expired);
+            expired->session->network->requests().ends().deadlinePassed(*expired);
           },
           this),
-      completion_(std::move(completion)) {}
-
-URLTransfer::~URLTransfer() {
-  giveReplyBack();
-}
+      completion_(std::move(completion)),
+      reply_(itsUser) {}
 
 void URLTransfer::cancel() {
   session->network->cancel(shared_from_this());
@@ -74,65 +43,62 @@ void URLTransfer::cancel() {
 void URLTransfer::deliver() {
   // What the completion holds is gone before anyone who waits for the last request goes on.
   if (URLCompletion completion = std::move(completion_)) {
-    const bool answered = !error_ || response_.status != 0;
-    completion(std::move(data_), answered ? std::optional(std::move(response_)) : std::nullopt,
+    const bool answered = !error_ || reply_.response().status != 0;
+    completion(std::move(data_), answered ? std::optional(reply_.takeResponse()) : std::nullopt,
                std::move(error_));
   }
-  giveReplyBack();
+  reply_.giveBack();
   session->network->completionHasRun();
 }
 
 void URLTransfer::takeReply(int status) {
-  response_.status = status;
-  data_.emplace(std::string_view(body_));
-  body_ = {};
+  URLResponse response = reply_.takeResponse();
+  response.status = status;
+  reply_.setResponse(std::move(response));
+  data_ = reply_.takeBody();
 }
 
 void URLTransfer::takeError(int32_t code, std::string description) {
-  URLResponse response = std::move(response_);
-  clearReply();
+  URLResponse response = reply_.takeResponse();
+  clearAttempt();
   const bool isOnTheWay = request.maxRedirects > 0 && response.status / 100 == 3;
-  if (!isOnTheWay) response_ = std::move(response);
+  if (!isOnTheWay) reply_.setResponse(std::move(response));
   error_.emplace(Error{kKYTURLErrorDomain, code, std::move(description)});
 }
 
-void URLTransfer::clearReply() {
-  body_ = {};
-  giveReplyBack();
-  response_ = {};
-  headerBytes_ = 0;
-  moved_ = 0;
-  errorText[0] = 0;
-  addresses.clear();
-  onlyCellularRoutes = replyTooLong = false;
-  hasBegun = wasToBeRepeated = foundEndedConnection = false;
-  endedWith.reset();
+void URLTransfer::clearAttempt() {
+  reply_.clear();
   leaveConnection();
-  connection.reset();
+  attempt = {};
 }
 
 bool URLTransfer::isUnheard() {
-  return connection != nullptr && connection->hasAcknowledgedNothingBehind(mark);
+  return attempt.connection != nullptr && attempt.connection->hasAcknowledgedNothingBehind(attempt.mark);
 }
 
 bool URLTransfer::sharesItsConnection() const {
-  return connection != nullptr &&
-         std::any_of(connection->transfers.begin(), connection->transfers.end(), [this](URLTransfer* other) {
-           return other != this && !other->endedWith && !other->isUnheard();
-         });
+  if (!attempt.connection) return false;
+  const std::vector<URLTransfer*>& all = attempt.connection->transfers;
+  return std::any_of(all.begin(), all.end(), [this](URLTransfer* other) {
+    return other != this && !other->attempt.endedWith && !other->isUnheard();
+  });
 }
 
 void URLTransfer::leaveConnection() {
-  if (connection) std::erase(connection->transfers, this);
+  if (attempt.connection) std::erase(attempt.connection->transfers, this);
 }
 
 void URLTransfer::configure(CURL* easy) {
-  const CurlLibrary& curl = session->network->curl();
-  if (headerList_.empty()) buildHeaders();
+  const CurlLibrary& curl = *session->network->tools().curl;
+  if (headers_.empty()) {
+    std::erase_if(request.method, [](char c) { return isControl(c) || c == ' '; });
+    headers_.make(request.headers, session->configuration.sourceApplication);
+    request.headers = {};  // the lines are what is sent, at each attempt
+  }
   curl.easySetOption(easy, CURLOPT_PRIVATE, this);
   curl.easySetOption(easy, CURLOPT_URL, request.url.c_str());
-  curl.easySetOption(easy, CURLOPT_HTTPHEADER, headerList_.data());
-  curl.easySetOption(easy, CURLOPT_ERRORBUFFER, errorText);
+  curl.easySetOption(easy, CURLOPT_HTTPHEADER, headers_.list());
+  curl.easySetOption(easy, CURLOPT_ERRORBUFFER, attempt.errorText);
   curl.easySetOption(easy, CURLOPT_HEADERFUNCTION, receiveHeader);
   curl.easySetOption(easy, CURLOPT_HEADERDATA, this);
   curl.easySetOption(easy, CURLOPT_WRITEFUNCTION, receiveBody);
@@ -162,103 +128,27 @@ void URLTransfer::configure(CURL* easy) {
   }
 }
 
-void URLTransfer::buildHeaders() {
-  std::erase_if(request.method, [](char c) { return isControl(c) || c == ' '; });
-  size_t bytes = 128 + session->configuration.sourceApplication.size();
-  for (const auto& [name, value] : request.headers) bytes += name.size() + value.size() + 3;
-  headerText_.reserve(bytes);
-  bool hasAccept = false, hasType = false;
-  for (const auto& [name, value] : request.headers) {
-    hasAccept = hasAccept || sameName(name, "Accept");
-    hasType = hasType || sameName(name, "Content-Type");
-    addHeader(name, value);
-  }
-  if (!session->configuration.sourceApplication.empty())
-    addHeader("X-KYT-Source-Application", session->configuration.sourceApplication);
-  // A name with nothing after its colon takes libcurl's own header away.
-  for (const auto& [suppressed, wanted] :
-       {std::pair("Expect:", true), std::pair("Accept:", !hasAccept), std::pair("Content-Type:", !hasType)}) {
-    if (wanted) headerText_.append(suppressed).push_back('\0');
-  }
-  headerList_.resize(static_cast<size_t>(std::count(headerText_.begin(), headerText_.end(), '\0')));
-  char* line = headerText_.data();
-  for (size_t i = 0; i < headerList_.size(); ++i) {
-    headerList_[i] = {line, i + 1 < headerList_.size() ? &headerList_[i + 1] : nullptr};
-    line += std::strlen(line) + 1;
-  }
-  request.headers = {};  // the lines are what is sent, at each attempt
-}
-
-void URLTransfer::addHeader(std::string_view name, std::string_view value) {
-  const auto isForbiddenInName = [](char c) { return isControl(c) || c == ':' || c == ' '; };
-  if (std::all_of(name.begin(), name.end(), isForbiddenInName)) return;
-  std::copy_if(name.begin(), name.end(), std::back_inserter(headerText_),
-               [&](char c) { return !isForbiddenInName(c); });
-  const bool isEmpty =
-      std::all_of(value.begin(), value.end(), [](char c) { return isControl(c) || c == ' '; });
-  if (isEmpty) {
-    headerText_.push_back(';');  // how libcurl is told of a header without a value
-  } else {
-    headerText_.append(": ");
-    std::copy_if(value.begin(), value.end(), std::back_inserter(headerText_),
-                 [](char c) { return !isControl(c); });
-  }
-  headerText_.push_back('\0');
-}
-
 size_t URLTransfer::receiveHeader(char* bytes, size_t size, size_t count, void* transfer) {
   auto& self = *static_cast<URLTransfer*>(transfer);
-  const std::string_view line(bytes, size * count);
-  self.lastProgress = self.session->network->now();
-  self.headerBytes_ += line.size();
-  self.replyTooLong = self.headerBytes_ > kMaxReplyHeaderBytes;
-  if (self.replyTooLong) return 0;
-  if (line.starts_with("HTTP/")) {  // a redirect's or an interim reply's headers are forgotten
-    self.response_ = {statusOf(line), {}};
-    return line.size();
-  }
-  const bool isTrailer = !self.body_.empty();
-  const size_t colon = line.find(':');
-  if (isTrailer || colon == std::string_view::npos || colon == 0) return line.size();
-  if (line.front() == ' ' || line.front() == '\t') return line.size();
-  self.response_.headers.emplace_back(withoutControls(trim(line.substr(0, colon))),
-                                      withoutControls(trim(line.substr(colon + 1))));
-  return line.size();
+  self.attempt.lastProgress = self.session->network->tools().now;
+  self.attempt.replyTooLong = self.reply_.takeHeader({bytes, size * count}) != ReceivedReply::Taken::yes;
+  return self.attempt.replyTooLong ? 0 : size * count;
 }
 
 size_t URLTransfer::receiveBody(char* bytes, size_t size, size_t count, void* transfer) {
   auto& self = *static_cast<URLTransfer*>(transfer);
-  self.lastProgress = self.session->network->now();
-  const size_t length = self.body_.size() + size * count;
-  self.replyTooLong = length > Limits::maxHTTPReplyBytes || !self.hasRoomFor(length);
-  if (self.replyTooLong) return 0;
-  self.body_.append(bytes, size * count);
-  return size * count;
-}
-
-// Mostly what a request counts covers its reply too. What is more counts in large steps.
-bool URLTransfer::hasRoomFor(size_t bodyBytes) {
-  constexpr size_t kStep = 65536;
-  const size_t covered = Limits::freeBytes + replyCharge_;
-  if (bodyBytes <= covered) return true;
-  const size_t more = std::max(kStep, bodyBytes - covered);
-  if (!user->takeReply(more)) {
-    session->network->countReplyWithoutRoom();
-    return false;
-  }
-  replyCharge_ += more;
-  return true;
-}
-
-void URLTransfer::giveReplyBack() {
-  if (replyCharge_ != 0) user->giveReplyBack(std::exchange(replyCharge_, 0));
+  self.attempt.lastProgress = self.session->network->tools().now;
+  const ReceivedReply::Taken taken = self.reply_.takeBody({bytes, size * count});
+  if (taken == ReceivedReply::Taken::noRoom) self.session->network->requests().countReplyWithoutRoom();
+  self.attempt.replyTooLong = taken != ReceivedReply::Taken::yes;
+  return self.attempt.replyTooLong ? 0 : size * count;
 }
 
 int URLTransfer::noteProgress(void* transfer, curl_off_t, curl_off_t received, curl_off_t, curl_off_t sent) {
   auto& self = *static_cast<URLTransfer*>(transfer);
-  if (self.moved_ != received + sent) {
-    self.moved_ = received + sent;
-    self.lastProgress = self.session->network->now();
+  if (self.attempt.moved != received + sent) {
+    self.attempt.moved = received + sent;
+    self.attempt.lastProgress = self.session->network->tools().now;
   }
   return 0;
 }
@@ -267,42 +157,42 @@ int URLTransfer::noteProgress(void* transfer, curl_off_t, curl_off_t received, c
 // ends without an answer, whatever the server has done with what it got: no setting forbids that.
 int URLTransfer::beginOn(void* transfer, char* peer, char* local, int peerPort, int localPort) {
   auto& self = *static_cast<URLTransfer*>(transfer);
-  self.wasToBeRepeated = self.hasBegun && !self.mayBeRepeated();
-  if (self.wasToBeRepeated) return CURL_PREREQFUNC_ABORT;
+  self.attempt.wasToBeRepeated = self.attempt.hasBegun && !self.mayBeRepeated();
+  if (self.attempt.wasToBeRepeated) return CURL_PREREQFUNC_ABORT;
   self.leaveConnection();
-  self.connection = self.pool->connectionBetween(local, localPort, peer, peerPort);
-  if (URLConnection* const chosen = self.connection.get()) {
-    self.foundEndedConnection =
+  self.attempt.connection = self.pool->connectionBetween(local, localPort, peer, peerPort);
+  if (URLConnection* const chosen = self.attempt.connection.get()) {
+    self.attempt.foundEndedConnection =
         chosen->requests > 0 && chosen->hasEnded() && self.endedConnections < kMaxEndedConnections;
-    if (self.foundEndedConnection) {
+    if (self.attempt.foundEndedConnection) {
       ++self.endedConnections;
       return CURL_PREREQFUNC_ABORT;
     }
-    self.mark = chosen->mark();
+    self.attempt.mark = chosen->mark();
     ++chosen->requests;
     chosen->transfers.push_back(&self);
-    if (self.addresses.empty()) self.addresses.push_back(chosen->peer());
+    if (self.attempt.addresses.empty()) self.attempt.addresses.push_back(chosen->peer());
   }
-  self.hasBegun = true;
-  self.response_ = {};
+  self.attempt.hasBegun = true;
+  self.reply_.forgetHeaders();
   return CURL_PREREQFUNC_OK;
 }
 
 curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockaddr* address) {
   auto& self = *static_cast<URLTransfer*>(transfer);
-  URLNetwork& network = *self.session->network;
-  self.wasToBeRepeated = self.hasBegun && !self.mayBeRepeated();
-  if (self.wasToBeRepeated) return CURL_SOCKET_BAD;
+  NetworkTools& tools = self.session->network->tools();
+  self.attempt.wasToBeRepeated = self.attempt.hasBegun && !self.mayBeRepeated();
+  if (self.attempt.wasToBeRepeated) return CURL_SOCKET_BAD;
   sockaddr_storage peer{};
   if (address->addrlen > sizeof peer) return CURL_SOCKET_BAD;
   std::memcpy(&peer, &address->addr, address->addrlen);
-  if (self.addresses.size() < kMaxAddresses) self.addresses.push_back(peer);
+  if (self.attempt.addresses.size() < kMaxAddresses) self.attempt.addresses.push_back(peer);
 
   std::string interface;
   if (!self.request.allowsCellularAccess) {
-    std::optional<std::string> found = network.routes().interfaceAvoidingCellular(address->addr);
+    std::optional<std::string> found = tools.routes.interfaceAvoidingCellular(address->addr);
     if (!found) {
-      self.onlyCellularRoutes = network.routes().isReachable(address->addr, false);
+      self.attempt.onlyCellularRoutes = tools.routes.isReachable(address->addr, false);
       errno = ENETUNREACH;
       return CURL_SOCKET_BAD;
     }
@@ -316,7 +206,7 @@ curl_socket_t URLTransfer::openSocket(void* transfer, curlsocktype, curl_sockadd
   if (!interface.empty())
     (void)setsockopt(opened, SOL_SOCKET, SO_BINDTODEVICE, interface.c_str(),
                      static_cast<socklen_t>(interface.size() + 1));
-  network.sockets().opened(opened);
+  tools.sockets.opened(opened);
   self.pool->opened(opened, std::move(interface), peer);
   return opened;
 }
