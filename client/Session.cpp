@@ -152,16 +152,16 @@ bool Session::finishAndWait(milliseconds timeout) {
     MutexLock lock(stateMutex_);
     finished_ = finished_ || success;  // a second goodbye that fails takes nothing back
     goodbyeOver_ = true;
-    stateChanged_.notify_all();
+    stateChanged_.notifyAll();
   };
   enqueueCommand(std::move(command));
   saidGoodbye_ = true;
   if (loop_->isCurrentThread()) return false;
   loop_->wake();  // without a daemon it gives up at once
-  std::unique_lock<std::mutex> lock(stateMutex_.native());
-  stateChanged_.wait_for(lock, std::min(timeout, kLongestWait),
-                         [this]() NO_THREAD_SAFETY_ANALYSIS { return goodbyeOver_; });
-  return [this]() NO_THREAD_SAFETY_ANALYSIS { return finished_; }();
+  const MonotonicTime end = std::chrono::steady_clock::now() + std::min(timeout, kLongestWait);
+  MutexLock lock(stateMutex_);
+  while (!goodbyeOver_ && stateChanged_.waitUntil(stateMutex_, end)) continue;
+  return finished_;
 }
 
 void Session::close() {
@@ -172,8 +172,8 @@ void Session::close() {
       return;
     }
     loop_->wake();
-    std::unique_lock<std::mutex> lock(stateMutex_.native());
-    stateChanged_.wait(lock, [this]() NO_THREAD_SAFETY_ANALYSIS { return ended_; });
+    MutexLock lock(stateMutex_);
+    while (!ended_) stateChanged_.wait(stateMutex_);
   }
   standing_.sayDrops(statistics());
 }
@@ -219,7 +219,7 @@ void Session::end(ClientError code, const std::string& reason) {
   MutexLock lock(stateMutex_);
   goodbyeOver_ = true;
   ended_ = true;
-  stateChanged_.notify_all();
+  stateChanged_.notifyAll();
 }
 
 // A completion may close the session: then the others have run before close() returns, and not with what the program

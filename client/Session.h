@@ -7,7 +7,6 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <deque>
 #include <memory>
 #include <optional>
@@ -16,6 +15,7 @@
 #include "client/Kept.h"
 #include "client/MessageRing.h"
 #include "client/Standing.h"
+#include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/linux/client/ClientSocket.h"
@@ -147,7 +147,7 @@ class Session {
   std::deque<std::unique_ptr<Command>> overflow_ GUARDED_BY(overflowMutex_);
   std::atomic<size_t> overflowed_{0};
   Mutex stateMutex_;
-  std::condition_variable stateChanged_;
+  ConditionVariable stateChanged_;
   bool finished_ GUARDED_BY(stateMutex_) = false;     // the goodbye was answered
   bool goodbyeOver_ GUARDED_BY(stateMutex_) = false;  // answered or failed
   bool ended_ GUARDED_BY(stateMutex_) = false;        // nothing runs any more

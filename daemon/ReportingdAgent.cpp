@@ -96,7 +96,7 @@ void ReportingdAgent::sessionWasInvalidated(const std::shared_ptr<ReportingdSess
   // Notified while locked: the shut-down that waits for this destroys the agent next.
   MutexLock lock(endMutex_);
   --unendedSessions_;
-  ended_.notify_all();
+  ended_.notifyAll();
 }
 
 void ReportingdAgent::invalidateReportingSession(const std::shared_ptr<ReportingdSession>& session) {
@@ -137,11 +137,12 @@ void ReportingdAgent::finishAllSessions() {
     if (connection != nullptr) connection->finish();
 }
 
-// The condition variable takes the native mutex, which the analysis does not see.
-bool ReportingdAgent::waitUntilSessionsHaveEnded(Duration timeout) NO_THREAD_SAFETY_ANALYSIS {
-  std::unique_lock<std::mutex> lock(endMutex_.native());
-  const auto haveEnded = [this]() NO_THREAD_SAFETY_ANALYSIS { return unendedSessions_ == 0; };
-  return ended_.wait_for(lock, timeout, haveEnded);
+bool ReportingdAgent::waitUntilSessionsHaveEnded(Duration timeout) {
+  const MonotonicTime end = std::chrono::steady_clock::now() + timeout;
+  MutexLock lock(endMutex_);
+  while (unendedSessions_ != 0)
+    if (!ended_.waitUntil(endMutex_, end)) return unendedSessions_ == 0;
+  return true;
 }
 
 }  // namespace kyt

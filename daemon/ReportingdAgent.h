@@ -12,7 +12,6 @@
 #pragma once
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -27,6 +26,7 @@
 #include "daemon/SessionCensus.h"
 #include "daemon/SharedDataStore.h"
 #include "platform/base/Clock.h"
+#include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
 #include "platform/ipc/Listener.h"
 #include "platform/objects/Value.h"
@@ -136,7 +136,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   std::vector<const ReportingdSession*> changedSessions_ GUARDED_BY(changedMutex_);
 
   Mutex endMutex_;
-  std::condition_variable ended_;
+  ConditionVariable ended_;
   size_t unendedSessions_ GUARDED_BY(endMutex_) = 0;
 };
 
