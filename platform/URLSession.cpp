@@ -66,6 +66,10 @@ size_t OutstandingBytes::User::mostWaiting() const {
   return account_ ? account_->most(Share::waitingBytes) : Limits::maxWaitingBytes;
 }
 
+uint64_t OutstandingBytes::User::owner() const {
+  return account_ ? uint64_t{account_->user()} + 1 : 0;
+}
+
 bool OutstandingBytes::User::take(size_t bytes) {
   size_t before = bytes_.load(std::memory_order_relaxed);
   do {

@@ -1,8 +1,10 @@
 // HTTP requests. Callers: the storebag fetch (one process-wide session) and the connectivity helper of each reporting
 // session. The real one is libcurl on one network thread (platform/linux/url/CurlURLSession.h).
 //
-// start() may be called from any thread and never blocks. A completion runs exactly once, on the URL session's own
-// serial delegate queue, never on the caller's thread before start() has returned, never on the network thread.
+// start() may be called from any thread and never blocks. A completion runs exactly once, on a serial delegate queue that
+// the URL session has for each user whose requests it carries (one, for most), never on the caller's thread before start()
+// has returned, never on the network thread. Users take turns: however many completions of one are due, another's runs
+// after a few hundred of them at most.
 // A request other than GET and HEAD is sent again by itself only where the server's TCP has acknowledged not a byte of
 // it. Only http and https; TLS 1.2 or newer, always verified; no cookies, no cache. 60 s without progress is a
 // time-out, and so is an attempt that takes longer than `Limits::requestSeconds` and what its body may take; a reply
@@ -90,6 +92,8 @@ class OutstandingBytes {
     void giveReplyBack(size_t bytes);
     // The most that may wait for a network.
     [[nodiscard]] size_t mostWaiting() const;
+    // Of the queue that runs its completions (SerialQueue): 0 for the daemon's own.
+    [[nodiscard]] uint64_t owner() const;
 
    private:
     friend class OutstandingBytes;

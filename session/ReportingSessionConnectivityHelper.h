@@ -3,8 +3,9 @@
 // not to the daemon. Each session owns one; single messages share one for the process
 // (session/ReportingdSessionClass.h).
 //
-// Any thread, never blocks. Completions run on the URL session's delegate queue. Destroying the helper lets
-// requests already started finish and call their completions. shared_ptr, since back ends hold it weakly.
+// Any thread, never blocks. Completions run on a delegate queue of the URL session, which has one for each user.
+// Destroying the helper lets requests already started finish and call their completions. shared_ptr, since back
+// ends hold it weakly.
 #pragma once
 
 #include <memory>

@@ -19,10 +19,16 @@ void Completions::begin(const CurlURLSessionOptions& session) {
   workers_ = std::make_unique<WorkerPool>(options);
 }
 
+const std::shared_ptr<SerialQueue>& Completions::queueOf(const URLTransfer& transfer) {
+  std::vector<std::shared_ptr<SerialQueue>>& queues = transfer.session->queues;
+  const uint64_t owner = transfer.user.owner();
+  for (const std::shared_ptr<SerialQueue>& queue : queues)
+    if (queue->owner() == owner) return queue;
+  return queues.emplace_back(SerialQueue::create("URL session", *workers_, owner));
+}
+
 void Completions::run(std::shared_ptr<URLTransfer> transfer) {
-  URLSessionState& session = *transfer->session;
-  if (!session.queue) session.queue = SerialQueue::create("URL session", *workers_);
-  const std::shared_ptr<SerialQueue> queue = session.queue;
+  const std::shared_ptr<SerialQueue> queue = queueOf(*transfer);
   queue->async([delivered = std::move(transfer)] { delivered->deliver(); });
 }
 

@@ -6,6 +6,7 @@
 #include <atomic>
 #include <map>
 #include <memory>
+#include <vector>
 
 #include "platform/URLSession.h"
 #include "platform/linux/url/LinkedList.h"
@@ -36,7 +37,7 @@ struct URLSessionState {
   Links<URLSessionState> links;           // among the sessions that have requests or connections
   LinkedList<URLTransfer> transfers;      // not yet completed, in the order in which they were started
   std::map<const OutstandingBytes::User*, WaitingLine> waiting;  // those of them that wait, by user
-  std::shared_ptr<SerialQueue> queue;                            // runs completions; made for the first one
+  std::vector<std::shared_ptr<SerialQueue>> queues;              // run completions, one for each user
   // Connections that may use cellular interfaces, and those that may not: never shared.
   std::unique_ptr<URLConnectionPool> pools[2];
 };
