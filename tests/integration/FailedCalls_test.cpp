@@ -29,6 +29,7 @@ using namespace std::chrono_literals;
 constexpr int kCalls = 10;
 constexpr std::chrono::seconds kPatience{
     20};  // of an end: the grace time of 5 s, and what has limits of its own
+constexpr int kRuleCases = 8;
 constexpr int kBefore = 5, kAfterwards = 6;  // client types with storebags of their own
 
 struct Failure {
@@ -327,29 +328,46 @@ TEST_F(EndOfTheDaemon, ComesEvenWhenItsMainThreadHangs) {
 }
 
 // The calls by which the daemon gives up what it could do.
-class ConfinementStep : public FailedCallsFixture, public ::testing::WithParamInterface<Failure> {};
+class ConfinementFixture : public FailedCallsFixture {
+ protected:
+  // Of these calls each that the start makes, from the `first` one on in steps of `step`.
+  void eachFailureEndsTheStart(const Failure& failure, int first = 1, int step = 1) {
+    int failed = 0;
+    for (;; first += step) {
+      SCOPED_TRACE(std::string(failure.name) + " " + std::to_string(first));
+      FailingDaemon daemon(server_.url(""));
+      daemon.fail(failure.call, failure.error, first);
+      ASSERT_TRUE(startsOrEnds(daemon)) << daemon.log();
+      daemon.stopFailing();
+      if (daemon.failures() == 0) {
+        EXPECT_TRUE(reports(daemon)) << daemon.log();
+        endsInOrder(daemon);
+        break;
+      }
+      ++failed;
+      EXPECT_EQ(daemon.exitStatus(), 255) << daemon.log();
+      EXPECT_TRUE(daemon.logged("<3>main: confine_init() fails: ")) << daemon.log();
+      EXPECT_FALSE(daemon.logged("Listener resumes")) << daemon.log();
+      if (HasFailure()) return;
+    }
+    EXPECT_GT(failed, 0);
+  }
+};
+
+class ConfinementStep : public ConfinementFixture, public ::testing::WithParamInterface<Failure> {};
 
 TEST_P(ConfinementStep, ThatFailsEndsTheStartWith255AndALine) {
-  int failed = 0;
-  for (int first = 1;; ++first) {
-    SCOPED_TRACE(std::string(GetParam().name) + " " + std::to_string(first));
-    FailingDaemon daemon(server_.url(""));
-    daemon.fail(GetParam().call, GetParam().error, first);
-    ASSERT_TRUE(startsOrEnds(daemon)) << daemon.log();
-    daemon.stopFailing();
-    if (daemon.failures() == 0) {
-      EXPECT_TRUE(reports(daemon)) << daemon.log();
-      endsInOrder(daemon);
-      break;
-    }
-    ++failed;
-    EXPECT_EQ(daemon.exitStatus(), 255) << daemon.log();
-    EXPECT_TRUE(daemon.logged("<3>main: confine_init() fails: ")) << daemon.log();
-    EXPECT_FALSE(daemon.logged("Listener resumes")) << daemon.log();
-    if (HasFailure()) return;
-  }
-  EXPECT_GT(failed, 0);
+  eachFailureEndsTheStart(GetParam());
 }
+
+// Hundreds of rules make the filters: a part of them in each case, by the number of the first one.
+class SystemCallRule : public ConfinementFixture, public ::testing::WithParamInterface<int> {};
+
+TEST_P(SystemCallRule, ThatCannotBeAddedEndsTheStartWith255AndALine) {
+  eachFailureEndsTheStart(KYT_FAILURE(seccomp_rule_add_array, ENOMEM), GetParam(), kRuleCases);
+}
+
+INSTANTIATE_TEST_SUITE_P(From, SystemCallRule, ::testing::Range(1, kRuleCases + 1));
 
 // What the kernel lists of the process: the filters that it runs under.
 std::string filtersOf(const FailingDaemon& daemon) {
@@ -397,6 +415,8 @@ const Failure kSteps[] = {
     KYT_FAILURE(landlock_add_rule, ENOMEM),
     KYT_FAILURE(landlock_restrict_self, E2BIG),
     KYT_FAILURE(setrlimit, EPERM),
+    KYT_FAILURE(seccomp_init, ENOMEM),
+    KYT_FAILURE(seccomp_attr_set, EINVAL),
     KYT_FAILURE(seccomp_load, ENOMEM),
 };
 

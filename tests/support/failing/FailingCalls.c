@@ -13,6 +13,7 @@
 #include <malloc.h>
 #include <poll.h>
 #include <pthread.h>
+#include <seccomp.h>
 #include <stdarg.h>
 #include <stdlib.h>
 #include <sys/epoll.h>
@@ -136,6 +137,15 @@ WRAPPED(void*, MAP_FAILED, mmap, (void* where, size_t size, int protection, int 
 WRAPPED(int, -1, statfs, (const char* path, struct statfs* status), (path, status))
 WRAPPED(pid_t, -1, waitpid, (pid_t process, int* status, int options), (process, status, options))
 WRAPPED(int, 0, malloc_trim, (size_t kept), (kept))
+
+/* These return the error. */
+WRAPPED(scmp_filter_ctx, NULL, seccomp_init, (uint32_t otherwise), (otherwise))
+WRAPPED(int, -errno, seccomp_attr_set,
+        (scmp_filter_ctx filter, enum scmp_filter_attr attribute, uint32_t value), (filter, attribute, value))
+WRAPPED(int, -errno, seccomp_rule_add_array,
+        (scmp_filter_ctx filter, uint32_t action, int number, unsigned count,
+         const struct scmp_arg_cmp* conditions),
+        (filter, action, number, count, conditions))
 
 /* The kernel never refuses to forget what it watches: for that it needs neither memory nor room. */
 int epoll_ctl(int epoll, int what, int fd, struct epoll_event* event) {

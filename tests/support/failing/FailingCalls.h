@@ -2,7 +2,7 @@
 #ifndef KYT_FAILING_CALLS_H
 #define KYT_FAILING_CALLS_H
 
-/* Functions of the C library by name, and calls that are made by number. */
+/* Functions of the C library, and of the one that makes filters of system calls, by name; calls made by number. */
 /* clang-format off */
 #define KYT_FAILING_FUNCTIONS(X) \
   X(open) X(openat) X(read) X(write) X(recvmsg) X(sendmsg) X(recv) X(recvfrom) X(send) X(sendto) X(accept4) \
@@ -10,7 +10,7 @@
   X(eventfd) X(timerfd_create) X(timerfd_settime) X(signalfd) X(stat) X(lstat) X(fstat) X(rename) X(fsync) \
   X(mkdir) X(opendir) X(readdir) X(unlink) X(fchmod) X(chmod) X(flock) X(ftruncate) X(fork) \
   X(pthread_create) X(poll) X(getrandom) X(setsockopt) X(getsockopt) X(setrlimit) X(getrlimit) X(prctl) \
-  X(mmap) X(statfs) X(waitpid) X(malloc_trim)
+  X(mmap) X(statfs) X(waitpid) X(malloc_trim) X(seccomp_init) X(seccomp_attr_set) X(seccomp_rule_add_array)
 #define KYT_FAILING_NUMBERS(X) \
   X(landlock_create_ruleset) X(landlock_add_rule) X(landlock_restrict_self) X(seccomp) X(capget) X(capset) \
   X(pidfd_open)
