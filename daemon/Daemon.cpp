@@ -147,9 +147,20 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
     return kCouldNotStart;
   }
   log.allowThreads();
-  DaemonServices services({settings, paths, log, counters, inspector, broker, std::move(reactor),
-                           std::move(acceptor), std::move(deflate), activated, memory,
-                           LinuxConfinement::descriptorLimit(), [&stopSignals] { stopSignals.request(); }});
+  DaemonServices services({.system = {.settings = settings,
+                                      .paths = paths,
+                                      .log = log,
+                                      .counters = counters,
+                                      .inspector = inspector,
+                                      .broker = broker,
+                                      .reactor = std::move(reactor),
+                                      .deflate = std::move(deflate),
+                                      .memory = memory,
+                                      .descriptors = LinuxConfinement::descriptorLimit()},
+                           .messageLogs = paths.messageLogs(),
+                           .acceptor = std::move(acceptor),
+                           .socketActivated = activated,
+                           .idle = [&stopSignals] { stopSignals.request(); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");

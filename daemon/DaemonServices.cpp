@@ -5,8 +5,6 @@
 
 #include "backends/BackendTable.h"
 #include "platform/base/Semaphore.h"
-#include "platform/linux/base/Threads.h"
-#include "platform/linux/service/Process.h"
 
 namespace kyt {
 
@@ -15,45 +13,6 @@ namespace {
 // How often the shut-down looks at what gives no event of its own.
 constexpr Duration kPollPeriod = std::chrono::milliseconds(5);
 constexpr Duration kCancelGrace = std::chrono::seconds(1);  // for what was cancelled to call its completions
-
-WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log, const UserBudget& budget) {
-  WorkerPoolOptions options;
-  options.counters = &counters;
-  options.log = &log;
-  options.maxWorkers = Limits::maxWorkers;
-  options.mostOfOneOwner = budget.most(Share::workers);
-  options.nameThread = beginServiceThread;
-  options.whenQuiet = giveFreeMemoryBack;
-  return options;
-}
-
-CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
-  CurlURLSessionOptions options;
-  options.certificateFile = settings.caFile;
-  options.cellularInterfaces = settings.cellularInterfaces;
-  options.whenQuiet = giveFreeMemoryBack;  // replies may end long after the last worker did
-  return options;
-}
-
-TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const UserBudget& budget) {
-  TomlUserDefaultsOptions options;
-  options.folder = paths.userDefaults();
-  options.mostIdentifiersOfAUser = budget.most(Share::identifiers);
-  return options;
-}
-
-DeviceSources deviceSources(const Paths& paths) {
-  DeviceSources sources;
-  sources.overrides = paths.device();
-  return sources;
-}
-
-// Under a private root, files of the daemon's own user may grant entitlements too.
-TomlEntitlementsOptions entitlementsOptions(const Paths& paths) {
-  TomlEntitlementsOptions options{paths.entitlements(), std::nullopt};
-  if (!paths.root.empty()) options.trustedUser = currentUser();
-  return options;
-}
 
 // What the wire protocol calls the machine's identifier: 32 hexadecimal digits that stay the same on this
 // device and tell nothing about it, since any client may ask for them.
@@ -98,66 +57,28 @@ class DaemonServices::Deadline {
 };
 
 DaemonServices::DaemonServices(Start start)
-    : settings_(start.settings),
-      log_(start.log),
-      counters_(start.counters),
+    : settings_(start.system.settings),
+      log_(start.system.log),
+      counters_(start.system.counters),
       idle_(std::move(start.idle)),
-      budget_(UserShares::of(settings_.limits, start.memory, start.descriptors)),
-      reactor_(std::move(start.reactor)),
-      workers_(workerPoolOptions(counters_, log_, budget_)),
-      deflate_(std::move(start.deflate)),
-      userDefaults_(userDefaultsOptions(start.paths, budget_), log_, counters_, clock_),
-      deviceProperties_(deviceSources(start.paths), cryptography_, log_, clock_),
-      consent_(userDefaults_),
-      clientBundle_(start.paths.clientBundle(), log_),
-      daemonBundle_(start.paths.daemonBundle(), log_),
-      entitlements_(entitlementsOptions(start.paths), start.inspector, log_, counters_, clock_),
-      urlSessions_(urlSessionOptions(settings_), log_, counters_),
-      fileExtensions_(start.broker, log_, counters_, budget_),
-      pluginBundles_(start.paths.root, log_),
-      powerLog_(counters_),
-      platform_{
-          .limits = settings_.limits,
-          .counters = counters_,
-          .log = log_,
-          .clock = clock_,
-          .timers = *reactor_,
-          .reactor = *reactor_,
-          .executor = workers_,
-          .random = random_,
-          .userDefaults = userDefaults_,
-          .deviceProperties = deviceProperties_,
-          .consent = consent_,
-          .cryptography = cryptography_,
-          .propertyLists = propertyLists_,
-          .json = json_,
-          .deflate = *deflate_,
-          .memory = memory_,
-          .urlSessions = urlSessions_,
-          .udpSockets = udpSockets_,
-          .clientBundle = clientBundle_,
-          .daemonBundle = daemonBundle_,
-          .fileExtensions = fileExtensions_,
-          .pluginBundles = pluginBundles_,
-          .powerLog = powerLog_,
-          .budget = budget_,
-      },
-      deviceIdentity_(platform_),
-      environment_(platform_, deviceIdentity_,
+      system_(std::move(start.system)),
+      deviceIdentity_(system_.ports),
+      environment_(system_.ports, deviceIdentity_,
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
-      configuration_{platform_, deviceIdentity_, environment_},
+      configuration_{system_.ports, deviceIdentity_, environment_},
       backendFactory_(configuration_, backendTable(configuration_)),
-      messageLog_(start.paths.messageLogs(), fileManager_, clock_, log_, counters_,
-                  budget_.most(Share::messageLogBytes)),
+      messageLog_(start.messageLogs, system_.files, system_.clock, log_, counters_,
+                  system_.budget.most(Share::messageLogBytes)),
       fetcher_(configuration_, backendClassLock_),
       sessionClass_(configuration_, backendFactory_, messageLog_),
-      queue_(SerialQueue::create("com.vantu.kytreportingd", workers_)),
-      lineLimits_(log_, clock_, *reactor_, queue_, budget_.most(Share::logLines)),
-      transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *reactor_, queue_,
+      queue_(SerialQueue::create("com.vantu.kytreportingd", system_.workers)),
+      lineLimits_(log_, system_.clock, *system_.reactor, queue_, system_.budget.most(Share::logLines)),
+      transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *system_.reactor, queue_,
                    [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),
-      listener_(DBusServerServices{settings_.limits, counters_, log_, clock_, *reactor_, workers_, *reactor_,
-                                   entitlements_, budget_, wireMachineId(deviceIdentity_, cryptography_)},
+      listener_(DBusServerServices{settings_.limits, counters_, log_, system_.clock, *system_.reactor,
+                                   system_.workers, *system_.reactor, system_.entitlements, system_.budget,
+                                   wireMachineId(deviceIdentity_, system_.cryptography)},
                 std::move(start.acceptor)) {
   listener_.setDelegate(agent_);
 }
@@ -168,12 +89,12 @@ void DaemonServices::resume() {
   listener_.resume();
   resumed_ = true;
   if (const auto interval = Watchdog::requestedInterval())
-    watchdog_.emplace(*interval, *reactor_, workers_, &ServiceManager::alive);
+    watchdog_.emplace(*interval, *system_.reactor, system_.workers, &ServiceManager::alive);
 }
 
 // Requests, and datagrams that are still sent again, may outlive their session.
 bool DaemonServices::isOutstanding() const {
-  return urlSessions_.outstanding() != 0 || udpSockets_.openSockets() != 0;
+  return system_.urlSessions.outstanding() != 0 || system_.udpSockets.openSockets() != 0;
 }
 
 // The idle time counts anew from the end of what a session left behind. A connection may be on its way to becoming a
@@ -196,23 +117,23 @@ bool DaemonServices::endWhenIdle() {
 }
 
 bool DaemonServices::shutDown() {
-  const Deadline deadline(clock_, settings_.limits.shutdownGraceSeconds);
+  const Deadline deadline(system_.clock, settings_.limits.shutdownGraceSeconds);
   // Where the system refuses threads the deadline holds all the same.
-  workers_.stopInsisting();
+  system_.workers.stopInsisting();
   listener_.stopAccepting();
   // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
   // monitor, which a download holds, and so that no session's end waits behind its own upload.
-  urlSessions_.cancelAwaited();
+  system_.urlSessions.cancelAwaited();
   endSessions(deadline);
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
     listener_.invalidateConnections();
   // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes.
-  const bool workersEnd = workers_.shutDownWithin(deadline.left() + kCancelGrace);
+  const bool workersEnd = system_.workers.shutDownWithin(deadline.left() + kCancelGrace);
   // Completions write to the message log and more that is destroyed before the URL sessions are.
-  const bool threadsEnd = urlSessions_.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
+  const bool threadsEnd = system_.urlSessions.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
   if (threadsEnd)
-    reactor_->stop();
+    system_.reactor->stop();
   else
     log_.error("shutDown: Threads still wait for what clients passed, ending without them");
   lineLimits_.finish();
@@ -226,7 +147,7 @@ bool DaemonServices::sessionsEndWithin(const Deadline& deadline) {
     const Duration left = deadline.left();
     if (agent_.waitUntilSessionsHaveEnded(std::min(left, kRefusedThreadPause))) return true;
     if (left <= Duration(0)) return false;
-    workers_.tryAgain();
+    system_.workers.tryAgain();
   }
 }
 
@@ -234,7 +155,7 @@ void DaemonServices::endSessions(const Deadline& deadline) {
   agent_.finishAllSessions();
   if (sessionsEndWithin(deadline)) return;
   log_.error("shutDown: Sessions have not ended in time, cancelling what they wait for");
-  urlSessions_.cancelAll();
+  system_.urlSessions.cancelAll();
   listener_.invalidateConnections();
   static_cast<void>(agent_.waitUntilSessionsHaveEnded(kCancelGrace));
 }
@@ -242,15 +163,16 @@ void DaemonServices::endSessions(const Deadline& deadline) {
 void DaemonServices::waitForRequests(const Deadline& deadline) {
   const auto done = [this] { return !isOutstanding(); };
   if (deadline.waitUntil(done)) return;
-  if (urlSessions_.outstanding() == 0) return;  // datagrams that nobody has acknowledged are given up
+  if (system_.urlSessions.outstanding() == 0) return;  // datagrams that nobody has acknowledged are given up
   log_.error("shutDown: Cancelling %zu requests that have not been answered in time",
-             urlSessions_.outstanding());
-  urlSessions_.cancelAll();
-  static_cast<void>(deadline.waitUntil([this] { return urlSessions_.outstanding() == 0; }, kCancelGrace));
+             system_.urlSessions.outstanding());
+  system_.urlSessions.cancelAll();
+  static_cast<void>(
+      deadline.waitUntil([this] { return system_.urlSessions.outstanding() == 0; }, kCancelGrace));
 }
 
 void DaemonServices::logFigures() {
-  const URLFigures figures = urlSessions_.figures();
+  const URLFigures figures = system_.urlSessions.figures();
   log_.normal("shutDown: %llu requests started, %llu completed, %llu failed",
               static_cast<unsigned long long>(figures.started),
               static_cast<unsigned long long>(figures.completed),

@@ -1,5 +1,5 @@
 // Every object of the running daemon, in the order in which each needs those before it; they are destroyed in
-// reverse. Made by runDaemon() after the process is confined.
+// reverse. Made by runDaemon() after the process is confined. What the system gives is one of them (DaemonPlatform.h).
 #pragma once
 
 #include <atomic>
@@ -13,41 +13,14 @@
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
 #include "config/StorebagFetcher.h"
+#include "daemon/DaemonPlatform.h"
 #include "daemon/ReportingdAgent.h"
-#include "platform/Deflate.h"
-#include "platform/Entitlements.h"
-#include "platform/Platform.h"
-#include "platform/base/Counters.h"
 #include "platform/base/Mutex.h"
-#include "platform/base/Paths.h"
-#include "platform/base/Settings.h"
-#include "platform/base/UserBudget.h"
 #include "platform/ipc/DBusServer.h"
-#include "platform/linux/base/EpollReactor.h"
-#include "platform/linux/base/LinuxClock.h"
-#include "platform/linux/base/LinuxUDPSocket.h"
-#include "platform/linux/data/LinuxMemoryInfo.h"
-#include "platform/linux/data/LinuxRandom.h"
-#include "platform/linux/data/OpenSSLCryptography.h"
-#include "platform/linux/data/PugixmlPropertyLists.h"
-#include "platform/linux/data/RapidJSON.h"
-#include "platform/linux/device/LinuxDeviceProperties.h"
-#include "platform/linux/device/TomlUserDefaults.h"
-#include "platform/linux/entitlements/TomlEntitlements.h"
-#include "platform/linux/files/LinuxFileManager.h"
-#include "platform/linux/helpers/DeletionBroker.h"
-#include "platform/linux/helpers/LinuxFileExtensions.h"
-#include "platform/linux/helpers/ProgramInspector.h"
-#include "platform/linux/plugins/DlopenPluginBundles.h"
-#include "platform/linux/service/JournalPowerLog.h"
 #include "platform/linux/service/ServiceManager.h"
 #include "platform/linux/service/Watchdog.h"
-#include "platform/linux/toml/TomlBundle.h"
-#include "platform/linux/url/CurlURLSession.h"
 #include "platform/queues/LineLimits.h"
-#include "platform/queues/Log.h"
 #include "platform/queues/SerialQueue.h"
-#include "platform/queues/WorkerPool.h"
 #include "session/MessageLogFiles.h"
 #include "session/ReportingdSessionClass.h"
 
@@ -56,18 +29,10 @@ namespace kyt {
 class DaemonServices {
  public:
   struct Start {
-    const Settings& settings;
-    const Paths& paths;
-    Log& log;
-    Counters& counters;
-    ProgramInspector& inspector;
-    const DeletionBroker* broker;  // null: uploaded files stay
-    std::unique_ptr<EpollReactor> reactor;
+    DaemonPlatform::Start system;
+    std::string messageLogs;  // folder
     std::unique_ptr<StreamAcceptor> acceptor;
-    std::unique_ptr<Deflate> deflate;
     bool socketActivated = false;
-    uint64_t memory = 0;       // bytes and
-    uint64_t descriptors = 0;  // descriptors that the daemon may use, for the shares of users
     // The daemon has been idle for long enough and nothing is outstanding. Any thread.
     std::function<void()> idle;
   };
@@ -97,33 +62,12 @@ class DaemonServices {
   Log& log_;
   Counters& counters_;
   const std::function<void()> idle_;
-  UserBudget budget_;
-  LinuxClock clock_;
-  std::unique_ptr<EpollReactor> reactor_;
-  WorkerPool workers_;
-  LinuxRandom random_;
-  LinuxMemoryInfo memory_;
-  OpenSSLCryptography cryptography_;
-  PugixmlPropertyLists propertyLists_;
-  RapidJSON json_;
-  const std::unique_ptr<Deflate> deflate_;
-  TomlUserDefaults userDefaults_;
-  LinuxDeviceProperties deviceProperties_;
-  DefaultsDiagnosticsConsent consent_;
-  TomlBundle clientBundle_, daemonBundle_;
-  TomlEntitlements entitlements_;
-  CurlURLSessionFactory urlSessions_;
-  LinuxUDPSocketFactory udpSockets_;
-  LinuxFileExtensions fileExtensions_;
-  DlopenPluginBundles pluginBundles_;
-  JournalPowerLog powerLog_;
-  Platform platform_;
+  DaemonPlatform system_;
 
   DeviceIdentity deviceIdentity_;
   Environment environment_;
   Configuration configuration_;
   DefaultBackendFactory backendFactory_;
-  LinuxFileManager fileManager_;
   MessageLogFiles messageLog_;
   Mutex backendClassLock_;
   StorebagFetcher fetcher_;

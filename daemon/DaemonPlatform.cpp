@@ -1,0 +1,96 @@
+#include "daemon/DaemonPlatform.h"
+
+#include <utility>
+
+#include "platform/base/Limits.h"
+#include "platform/linux/base/Threads.h"
+#include "platform/linux/service/Process.h"
+
+namespace kyt {
+
+namespace {
+
+WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log, const UserBudget& budget) {
+  WorkerPoolOptions options;
+  options.counters = &counters;
+  options.log = &log;
+  options.maxWorkers = Limits::maxWorkers;
+  options.mostOfOneOwner = budget.most(Share::workers);
+  options.nameThread = beginServiceThread;
+  options.whenQuiet = giveFreeMemoryBack;
+  return options;
+}
+
+CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
+  CurlURLSessionOptions options;
+  options.certificateFile = settings.caFile;
+  options.cellularInterfaces = settings.cellularInterfaces;
+  options.whenQuiet = giveFreeMemoryBack;  // replies may end long after the last worker did
+  return options;
+}
+
+TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const UserBudget& budget) {
+  TomlUserDefaultsOptions options;
+  options.folder = paths.userDefaults();
+  options.mostIdentifiersOfAUser = budget.most(Share::identifiers);
+  return options;
+}
+
+DeviceSources deviceSources(const Paths& paths) {
+  DeviceSources sources;
+  sources.overrides = paths.device();
+  return sources;
+}
+
+// Under a private root, files of the daemon's own user may grant entitlements too.
+TomlEntitlementsOptions entitlementsOptions(const Paths& paths) {
+  TomlEntitlementsOptions options{paths.entitlements(), std::nullopt};
+  if (!paths.root.empty()) options.trustedUser = currentUser();
+  return options;
+}
+
+}  // namespace
+
+DaemonPlatform::DaemonPlatform(Start start)
+    : budget(UserShares::of(start.settings.limits, start.memory, start.descriptors)),
+      reactor(std::move(start.reactor)),
+      workers(workerPoolOptions(start.counters, start.log, budget)),
+      deflate(std::move(start.deflate)),
+      userDefaults(userDefaultsOptions(start.paths, budget), start.log, start.counters, clock),
+      deviceProperties(deviceSources(start.paths), cryptography, start.log, clock),
+      consent(userDefaults),
+      clientBundle(start.paths.clientBundle(), start.log),
+      daemonBundle(start.paths.daemonBundle(), start.log),
+      entitlements(entitlementsOptions(start.paths), start.inspector, start.log, start.counters, clock),
+      urlSessions(urlSessionOptions(start.settings), start.log, start.counters),
+      fileExtensions(start.broker, start.log, start.counters, budget),
+      pluginBundles(start.paths.root, start.log),
+      powerLog(start.counters),
+      ports{
+          .limits = start.settings.limits,
+          .counters = start.counters,
+          .log = start.log,
+          .clock = clock,
+          .timers = *reactor,
+          .reactor = *reactor,
+          .executor = workers,
+          .random = random,
+          .userDefaults = userDefaults,
+          .deviceProperties = deviceProperties,
+          .consent = consent,
+          .cryptography = cryptography,
+          .propertyLists = propertyLists,
+          .json = json,
+          .deflate = *deflate,
+          .memory = memory,
+          .urlSessions = urlSessions,
+          .udpSockets = udpSockets,
+          .clientBundle = clientBundle,
+          .daemonBundle = daemonBundle,
+          .fileExtensions = fileExtensions,
+          .pluginBundles = pluginBundles,
+          .powerLog = powerLog,
+          .budget = budget,
+      } {}
+
+}  // namespace kyt
