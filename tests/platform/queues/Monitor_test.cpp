@@ -62,11 +62,11 @@ TEST(Monitor, LetsOneThreadInAtATime) {
     for (int i = 0; i < 8; ++i)
       threads.emplace_back([&] {
         for (int round = 0; round < 2000; ++round) {
-          const MonitorLock lock(monitor);
-          const MonitorLock again(monitor);
+          takeTwice(monitor);
           EXPECT_EQ(++inside, 1);
           ++entered;
           --inside;
+          giveBack(monitor);
         }
       });
   }
