@@ -82,8 +82,8 @@ std::optional<uint16_t> DashboardDatagram::acknowledgedEvent(std::span<const std
 
 void DashboardDatagram::appendPair(const char* key, const char* value) {
   char soFar[kTextSize];
-  std::memcpy(soFar, text(), textLength_ + 1);
-  const int whole = std::snprintf(text(), kTextSize, "%s %s=%s", soFar, key, value);
+  std::memcpy(soFar, writableText(), textLength_ + 1);
+  const int whole = std::snprintf(writableText(), kTextSize, "%s %s=%s", soFar, key, value);
   textLength_ = std::min(static_cast<size_t>(std::max(whole, 0)), kTextSize - 1);
 }
 

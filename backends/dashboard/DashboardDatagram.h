@@ -52,7 +52,7 @@ class DashboardDatagram {
   struct Fields;
   void put(const Field& field, uint64_t number);
   [[nodiscard]] uint32_t number(const Field& field) const;
-  [[nodiscard]] char* text() { return reinterpret_cast<char*>(bytes_.data() + kHeaderSize); }
+  [[nodiscard]] char* writableText() { return reinterpret_cast<char*>(bytes_.data() + kHeaderSize); }
   std::array<std::byte, kSize> bytes_{};
   size_t textLength_ = 0;
 };
