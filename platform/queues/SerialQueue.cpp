@@ -99,6 +99,14 @@ bool SerialQueue::isCurrent() const noexcept {
 }
 
 void SerialQueue::async(Task task) {
+  submit(std::move(task), true);
+}
+
+void SerialQueue::asyncBeside(Task task) {
+  submit(std::move(task), false);
+}
+
+void SerialQueue::submit(Task task, bool mayDefer) {
   Node* node = NodeCache::ofThread().make(std::move(task));
   std::shared_ptr<SerialQueue> self;
   uintptr_t state = state_.load(std::memory_order_relaxed);
@@ -112,7 +120,7 @@ void SerialQueue::async(Task task) {
     }
   } while (!state_.compare_exchange_weak(state, next, std::memory_order_acq_rel, std::memory_order_relaxed));
   // The list owns the node from here on.  NOLINTNEXTLINE(clang-analyzer-cplusplus.NewDeleteLeaks)
-  if ((state & kFlags) == 0) schedule(std::move(self), true);
+  if ((state & kFlags) == 0) schedule(std::move(self), mayDefer);
 }
 
 void SerialQueue::schedule(std::shared_ptr<SerialQueue> self, bool mayDefer) {

@@ -3,7 +3,7 @@
 //
 // - async(): the work runs later. On a thread inside a Turn (a connection's worker that handles its client's calls) an
 //   idle queue wakes no other thread: the turn runs the queue at its end at the latest. Elsewhere the executor gives
-//   it a worker.
+//   it a worker. asyncBeside() leaves it to the executor in any case.
 // - sync(): runs the work on the caller's thread and returns after it. Waits while another thread runs the queue.
 //   Runs earlier work that has not begun first. On an idle queue it costs one uncontended atomic exchange each way.
 //   A call from a queue onto itself is a bug: it ends the program with a line.
@@ -42,6 +42,9 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
   SerialQueue& operator=(const SerialQueue&) = delete;
 
   void async(Task task);
+  // As async(), but a turn does not keep the work: the executor gives it a worker at once. For long work that is to go on
+  // beside the caller's.
+  void asyncBeside(Task task);
 
   template <typename F>
   std::invoke_result_t<F&> sync(F&& f) EXCLUDES(this) {
@@ -83,6 +86,7 @@ class CAPABILITY("queue") SerialQueue : public std::enable_shared_from_this<Seri
   struct NodeCache;
   struct Concrete;
   SerialQueue(const char* label, Executor& executor, uint64_t owner);
+  void submit(Task task, bool mayDefer);
   void enter();  // waits until this thread is the one that runs the queue, and runs what came before
   void leave();
   void enterContended();

@@ -242,6 +242,18 @@ TEST_F(TurnTest, RunsWhatItWasGivenAtItsEndOnItsThread) {
   EXPECT_EQ(Turn::current(), nullptr);
 }
 
+TEST_F(TurnTest, LeavesWorkBesideItToTheExecutorAtOnce) {
+  const auto queue = makeQueue();
+  {
+    const Turn turn;
+    queue->asyncBeside(note("beside"));
+    EXPECT_EQ(executor_.pending(), 1u);
+  }
+  EXPECT_TRUE(notes_.empty());
+  executor_.runAll();
+  EXPECT_EQ(notes_, Notes{"beside"});
+}
+
 TEST_F(TurnTest, LeavesWorkToASynchronousCallThatComesFirst) {
   auto queue = makeQueue();
   Turn turn;
