@@ -77,9 +77,15 @@ HTTPSPostBackend::HTTPSPostBackend(Making making, Configuration& configuration, 
       records_(configuration, sharedFacts()),
       decision_(decisionOf(configuration.platform)),
       device_(readDevice()),
-      rules_(configuration.platform, {this->name(), clientsOf(this->profile()), sharedFacts(),
-                                      samplingFactor(), device_.dnuEnabled}) {
+      rules_(configuration.platform,
+             {this->name(), clientsOf(this->profile()), sharedFacts(), samplingFactor(), device_.dnuEnabled}),
+      line_(configuration.platform.executor) {
   setDisplayURL(textEntry(&this->profile(), "display_url"));
+}
+
+void HTTPSPostBackend::cleanup() {
+  line_.finish();
+  KYTReportingBackend::cleanup();
 }
 
 HTTPSPostBackend::~HTTPSPostBackend() {
@@ -205,13 +211,14 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
                        facts().requireUserInfo);
   Array records;
   records.append(Value(std::move(record)));
-  PostRequest::Message message = makeMessage(std::move(records), true);
+  const PostRequest post(configuration_, postFacts());
+  PostRequest::Message message = makeMessage(post, std::move(records));
+  const bool mayBeShown = post.mayBeShown();
   const String* before = flushed.string();
-  const size_t least =
-      (message.mayBeShown ? message.prettySize : 0) + (before != nullptr ? before->size() : 0);
+  const size_t least = (mayBeShown ? message.prettySize : 0) + (before != nullptr ? before->size() : 0);
   Value text;
-  if ((message.mayBeShown || before != nullptr) && isAnswerWanted(least)) {
-    if (message.mayBeShown) text = PostRequest::prettyText(message.json);
+  if ((mayBeShown || before != nullptr) && isAnswerWanted(least)) {
+    if (mayBeShown) text = PostRequest::prettyText(message.json);
     if (before != nullptr)
       text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
   }
@@ -242,9 +249,8 @@ PostFacts HTTPSPostBackend::postFacts() const {
   return post;
 }
 
-PostRequest::Message HTTPSPostBackend::makeMessage(Array records, bool asksWhetherItMayBeShown) {
-  PostRequest::Message message =
-      PostRequest(configuration_, postFacts()).message(std::move(records), asksWhetherItMayBeShown);
+PostRequest::Message HTTPSPostBackend::makeMessage(const PostRequest& post, Array records) {
+  PostRequest::Message message = post.message(std::move(records));
   jsonSizeHint_ = message.json.size();
   return message;
 }
@@ -252,15 +258,25 @@ PostRequest::Message HTTPSPostBackend::makeMessage(Array records, bool asksWheth
 std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Array records,
                                                                             Value* prettyJSONString,
                                                                             size_t* events) {
-  PostRequest::Message message = makeMessage(std::move(records), prettyJSONString != nullptr);
+  const PostRequest post(configuration_, postFacts());
+  PostRequest::Message message = makeMessage(post, std::move(records));
   if (events != nullptr) *events = message.events;
-  if (message.mayBeShown) *prettyJSONString = PostRequest::prettyText(message.json);
+  if (prettyJSONString != nullptr && post.mayBeShown())
+    *prettyJSONString = PostRequest::prettyText(message.json);
   return std::move(message.json);
 }
 
 void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
                                        std::optional<uint16_t> responseCode, FlushCompletion completion,
                                        size_t events) {
+  line_.finish();  // what was posted before leaves before
+  std::optional<OutgoingPost> post = newPost(flag, method, responseCode, std::move(completion), events);
+  if (post) std::move(*post).send(std::move(json));
+}
+
+std::optional<OutgoingPost> HTTPSPostBackend::newPost(MessageFlag flag, std::optional<uint16_t> method,
+                                                      std::optional<uint16_t> responseCode,
+                                                      FlushCompletion completion, size_t events) {
   const std::optional<String>& url = isRealtime(flag) ? decision_.realtimePostURL : decision_.postURL;
   if (!url) {
     platform().counters.add(Reason::postWithoutURL, events);
@@ -270,21 +286,13 @@ void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::
           "HTTPSPostBackend(postJsonMessage): The storebag's %s has no post_url for client type %d: %zu events are lost",
           name().c_str(), facts().compType, events);
     if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
-    return;
+    return std::nullopt;
   }
-  std::optional<EventMap> eventMap;
-  if (method && responseCode) eventMap = EventMap{*method, *responseCode};
-  URLRequest request = PostRequest(configuration_, postFacts()).request(*url, std::move(json), eventMap);
-  const auto delegate = connectivityDelegate();
-  // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
-  if (delegate == nullptr) {
-    platform().counters.add(Reason::postWithoutPoster, events);
-    return;
-  }
-  std::string address = request.url.substr(0, request.url.find('?'));
-  delegate->postURLRequestWithCompletionHandler(
-      std::move(request), PostReply{weak_from_this(), platform(), name(), std::move(completion), events,
-                                    std::move(address), userAccount()});
+  OutgoingPost post{
+      PostRequest(configuration_, postFacts()), *url, std::nullopt, connectivityDelegate(),
+      PostReply{weak_from_this(), platform(), name(), std::move(completion), events, {}, userAccount()}};
+  if (method && responseCode) post.eventMap = EventMap{*method, *responseCode};
+  return post;
 }
 
 }  // namespace kyt

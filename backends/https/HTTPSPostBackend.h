@@ -5,7 +5,8 @@
 //
 // This is the face, whose operations are a contract and therefore many; the work is done by RecordMaker (an event's
 // record), ClientRules (what the storebag decides: a Decision), EventBatch (the records that wait), PostRequest (the
-// message and its request) and PostReply (what the answer means).
+// message and its request), PostReply (what the answer means), and PostLine (large batches are posted beside the session's
+// queue).
 //
 // Threads: called on its session's queue. `setCorrelatedSessionID`, `batchedEventsSize` and the properties
 // that the base keeps on the state queue may be called from any thread, as other sessions and the health
@@ -19,11 +20,14 @@
 #include <optional>
 #include <string>
 #include <utility>
+#include <variant>
 
 #include "backend/KYTReportingBackend.h"
 #include "backends/https/ClientRules.h"
 #include "backends/https/Decision.h"
 #include "backends/https/EventBatch.h"
+#include "backends/https/OutgoingPost.h"
+#include "backends/https/PostLine.h"
 #include "backends/https/PostRequest.h"
 #include "backends/https/RecordMaker.h"
 #include "config/Configuration.h"
@@ -41,6 +45,8 @@ class HTTPSPostBackend : public KYTReportingBackend {
                    SharedSessionFacts facts);
   ~HTTPSPostBackend() override;
 
+  // When it returns everything that was to be posted has been handed to the poster.
+  void cleanup() override;
   using KYTReportingBackend::sendMessage;
   Value sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method, uint16_t respCode,
                     EventID eventID, MessageFlag flag) override;
@@ -107,13 +113,20 @@ class HTTPSPostBackend : public KYTReportingBackend {
   [[nodiscard]] const Dictionary* userInfo() const { return userInfoDict() ? &*userInfoDict() : nullptr; }
   [[nodiscard]] bool lacksUserInfo() const;
   void addStopEntries(Dictionary& payload) const;
-  [[nodiscard]] PostRequest::Message makeMessage(Array records, bool asksWhetherItMayBeShown);
+  [[nodiscard]] PostRequest::Message makeMessage(const PostRequest& post, Array records);
+  // None without an address, which the completion has been told.
+  [[nodiscard]] std::optional<OutgoingPost> newPost(MessageFlag flag, std::optional<uint16_t> method,
+                                                    std::optional<uint16_t> responseCode,
+                                                    FlushCompletion completion, size_t events);
   Value sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                        MessageFlag flag);
 
   // The batch.
   // The text of the flush alone is made where somebody wants it, that of one that goes before an event always.
   Value flush(FlushCompletion completion, TextOf text);
+  // `bytes` are what the records count with the user.
+  Value postBatch(Array records, uint64_t bytes, FlushCompletion completion, TextOf text);
+  void postBeside(std::variant<Array, PostRequest::Message> batch, uint64_t bytes);
   [[nodiscard]] bool hasRoomFor(uint64_t batched, uint64_t bytes) const;
   void giveBackToUser(uint64_t bytes) const;
   void countDroppedByLimit() const;
@@ -134,6 +147,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   ClientRules rules_;
   bool immutable_ = false;   // once set, the state is no longer decided anew
   size_t jsonSizeHint_ = 0;  // size of the last message
+  PostLine line_;
 
   EventBatch batch_ GUARDED_BY(stateQueue());
 };

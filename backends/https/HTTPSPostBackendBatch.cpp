@@ -149,20 +149,53 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
     return {};
   }
-  PostRequest::Message message = makeMessage(std::move(records), true);
+  return postBatch(std::move(records), bytes, std::move(completion), text);
+}
+
+Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion completion, TextOf text) {
+  const PostRequest post(configuration_, postFacts());
+  const bool mayBeShown = post.mayBeShown();
+  const bool mayGoBeside =
+      !completion && text == TextOf::flush && bytes >= PostLine::kLeastBytes && decision_.postURL;
+  if (mayGoBeside && !mayBeShown) {
+    postBeside(std::move(records), bytes);
+    return {};
+  }
+  PostRequest::Message message = makeMessage(post, std::move(records));
   Value pretty;
-  if (message.mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
+  if (mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
     pretty = PostRequest::prettyText(message.json);
-  giveBackToUser(bytes);  // the request counts by itself
-  FlushCompletion answer;
-  if (completion)
-    answer = [pretty, completion = std::move(completion)](const Value&, std::optional<Error> error) mutable {
-      completion(pretty, std::move(error));
-    };
-  postJSONMessage(std::move(message.json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer),
-                  message.events);
-  if (message.mayBeShown) immutable_ = true;
+  if (mayGoBeside && pretty.isNull()) {
+    postBeside(std::move(message), bytes);
+  } else {
+    giveBackToUser(bytes);  // the request counts by itself
+    FlushCompletion answer;
+    if (completion)
+      answer = [pretty, completion = std::move(completion)](const Value&,
+                                                            std::optional<Error> error) mutable {
+        completion(pretty, std::move(error));
+      };
+    postJSONMessage(std::move(message.json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer),
+                    message.events);
+  }
+  if (mayBeShown) immutable_ = true;
   return pretty;
+}
+
+// The records count with the user until the request does.
+void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batch, uint64_t bytes) {
+  std::optional<OutgoingPost> post = newPost(MessageFlag{0}, std::nullopt, std::nullopt, nullptr, 0);
+  if (!post) return giveBackToUser(bytes);
+  line_.add([post = std::move(*post), batch = std::move(batch), bytes]() mutable {
+    const std::shared_ptr<UserAccount> account = post.reply.account;
+    const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
+    PostRequest::Message message = std::holds_alternative<Array>(batch)
+                                       ? post.post.message(std::get<Array>(std::move(batch)))
+                                       : std::get<PostRequest::Message>(std::move(batch));
+    if (account != nullptr) account->giveBack(Share::bytes, bytes);
+    post.reply.events = message.events;
+    std::move(post).send(std::move(message.json));
+  });
 }
 
 bool HTTPSPostBackend::admits(const Dictionary& record) const {

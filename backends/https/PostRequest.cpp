@@ -90,7 +90,7 @@ bool PostRequest::mayBeShown() const {
   return (facts_.settingShowsText && inSuchAnEnvironment) || facts_.consentShowsText;
 }
 
-PostRequest::Message PostRequest::message(Array records, bool asksWhetherItMayBeShown) const {
+PostRequest::Message PostRequest::message(Array records) const {
   Platform& platform = configuration_.platform;
   Value* values = records.mutableBegin();
   for (size_t i = 0; i < records.size(); ++i) removeUnpostable(*values[i].mutableDictionary());
@@ -114,7 +114,6 @@ PostRequest::Message PostRequest::message(Array records, bool asksWhetherItMayBe
   made.json.reserve(facts_.sizeHint + facts_.sizeHint / 8);
   platform.json.writeCompact(message, made.json);
   made.prettySize += made.json.size();
-  if (asksWhetherItMayBeShown) made.mayBeShown = mayBeShown();
   return made;
 }
 

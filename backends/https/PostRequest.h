@@ -40,15 +40,16 @@ struct EventMap {
 class PostRequest {
  public:
   struct Message {
-    std::string json;         // the body before compression
-    bool mayBeShown = false;  // as a pretty text; not looked at unless that was asked
-    size_t prettySize = 0;    // of that text, in bytes
-    size_t events = 0;        // records in the body: all, or none without a client ID
+    std::string json;       // the body before compression
+    size_t prettySize = 0;  // of its pretty text, in bytes
+    size_t events = 0;      // records in the body: all, or none without a client ID
   };
 
   PostRequest(const Configuration& configuration, PostFacts facts);
 
-  [[nodiscard]] Message message(Array records, bool asksWhetherItMayBeShown) const;
+  // Whether the message may be shown as a pretty text.
+  [[nodiscard]] bool mayBeShown() const;
+  [[nodiscard]] Message message(Array records) const;
   // The same message for people. Made of its text, so it costs little, and nothing where nobody asks.
   [[nodiscard]] static Value prettyText(std::string_view json);
   // `url` is as the storebag gives it.
@@ -57,7 +58,6 @@ class PostRequest {
 
  private:
   void removeUnpostable(Dictionary& record) const;
-  [[nodiscard]] bool mayBeShown() const;
   [[nodiscard]] std::string addressWithForcedScheme(const String& url) const;
   [[nodiscard]] std::string digestOfBody(const Data& body) const;
 

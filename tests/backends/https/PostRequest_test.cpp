@@ -23,9 +23,7 @@ class PostRequestTest : public testing::Test {
     platform_.clock.setTimeOfDay({1000000130, 250000});
   }
   PostRequest post() { return {platform_.configuration, facts_}; }
-  PostRequest::Message message(Array records, bool asksWhetherItMayBeShown = true) {
-    return post().message(std::move(records), asksWhetherItMayBeShown);
-  }
+  PostRequest::Message message(Array records) { return post().message(std::move(records)); }
   URLRequest request(std::string json = "{}", const std::optional<EventMap>& eventMap = std::nullopt) {
     return post().request("https://post.example.org/events?k", std::move(json), eventMap);
   }
@@ -61,13 +59,11 @@ TEST_F(PostRequestTest, WhatCannotBePostedLeavesTheRecord) {
 }
 
 TEST_F(PostRequestTest, AMessageMayBeShownByConsentAndByASettingInSomeEnvironments) {
-  const Array records{Dictionary{{"k", 1}}};
-  EXPECT_FALSE(message(records).mayBeShown);
+  EXPECT_FALSE(post().mayBeShown());
   facts_.settingShowsText = true;  // in environments that are no user's
-  EXPECT_FALSE(message(records).mayBeShown);
+  EXPECT_FALSE(post().mayBeShown());
   facts_.consentShowsText = true;
-  EXPECT_FALSE(message(records, false).mayBeShown) << "not asked";
-  EXPECT_TRUE(message(records).mayBeShown);
+  EXPECT_TRUE(post().mayBeShown());
 }
 
 TEST_F(PostRequestTest, ThePrettyTextIsThatOfTheWriter) {
@@ -142,7 +138,7 @@ TEST_F(PostRequestTest, IsMadeOnAnyThreadAfterItsBackEndHasGone) {
   facts_ = {};
   std::string json;
   std::thread other([&, request = std::move(request), records = std::move(records)]() mutable {
-    json = request->message(std::move(records), false).json;
+    json = request->message(std::move(records)).json;
   });
   other.join();
   EXPECT_NE(json.find(R"("clientId":"an identifier","events":[{"k":1}])"), std::string::npos);

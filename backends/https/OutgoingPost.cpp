@@ -1,0 +1,21 @@
+#include "backends/https/OutgoingPost.h"
+
+#include <utility>
+
+#include "platform/Platform.h"
+#include "platform/base/Counters.h"
+
+namespace kyt {
+
+void OutgoingPost::send(std::string json) && {
+  URLRequest request = post.request(url, std::move(json), eventMap);
+  // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
+  if (poster == nullptr) {
+    reply.platform.counters.add(Reason::postWithoutPoster, reply.events);
+    return;
+  }
+  reply.address = request.url.substr(0, request.url.find('?'));
+  poster->postURLRequestWithCompletionHandler(std::move(request), std::move(reply));
+}
+
+}  // namespace kyt
