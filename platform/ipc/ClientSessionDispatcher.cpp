@@ -1,5 +1,6 @@
 #include "platform/ipc/ClientSessionDispatcher.h"
 
+#include <array>
 #include <optional>
 #include <utility>
 #include <vector>
@@ -8,18 +9,26 @@
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/BodyValidator.h"
 #include "platform/ipc/ClientSessionReplies.h"
+#include "platform/ipc/Contract.h"
 #include "platform/ipc/InterfaceDescription.h"
 
 namespace kyt {
 namespace {
 
 using Peer = ClientSessionDispatcher::Peer;
+using wire::Method;
 
 // Each operation reads its arguments and, when they are whole, calls the session. A call of an operation
 // without results is answered when the operation has returned.
 
 CallReply replyTo(const Message& message, const Peer& peer) {
   return {message, peer.output};
+}
+
+// Replies with what `body` writes in the form that the contract has for the method.
+template <typename Body>
+void answer(CallReply& reply, Method method, Body&& body) {
+  reply.answer(wire::contractOf(method).reply, std::forward<Body>(body));
 }
 
 void setSessionInfo(const Message& message, const Peer& peer, BodyReader& in) {
@@ -38,52 +47,56 @@ void setSessionInfo(const Message& message, const Peer& peer, BodyReader& in) {
   reply.answerNothing();
 }
 
-StatesReply statesReply(const Message& message, const Peer& peer) {
-  return [reply = replyTo(message, peer)](std::optional<Array> states) mutable {
-    reply.answer("aas", [&](MessageWriter& out) { out.writeOptionalStrings(states); });
+StatesReply statesReply(Method method, const Message& message, const Peer& peer) {
+  return [method, reply = replyTo(message, peer)](std::optional<Array> states) mutable {
+    answer(reply, method, [&](MessageWriter& out) { out.writeOptionalStrings(states); });
   };
 }
 
 void startConfig(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() == BodyStatus::ok)
-    peer.session.startConfigWithCompletionHandler(statesReply(message, peer));
+    peer.session.startConfigWithCompletionHandler(
+        statesReply(Method::startConfigWithCompletionHandler, message, peer));
 }
 
 void fetchStates(const Message& message, const Peer& peer, BodyReader& in) {
   std::optional<Dictionary> userInfo;
   in.readOptionalDictionary(userInfo);
   if (in.finish() != BodyStatus::ok) return;
-  peer.session.fetchStatesWithUserInfo(std::move(userInfo), statesReply(message, peer));
+  peer.session.fetchStatesWithUserInfo(std::move(userInfo),
+                                       statesReply(Method::fetchStatesWithUserInfo, message, peer));
 }
 
-StringReply stringReply(const Message& message, const Peer& peer) {
-  return [reply = replyTo(message, peer)](String text) mutable {
-    reply.answer("s", [&](MessageWriter& out) { out.writeString(text); });
+StringReply stringReply(Method method, const Message& message, const Peer& peer) {
+  return [method, reply = replyTo(message, peer)](String text) mutable {
+    answer(reply, method, [&](MessageWriter& out) { out.writeString(text); });
   };
 }
 
 void fetchDisplayURL(const Message& message, const Peer& peer, BodyReader& in) {
-  if (in.finish() == BodyStatus::ok) peer.session.fetchDisplayURL(stringReply(message, peer));
+  if (in.finish() == BodyStatus::ok)
+    peer.session.fetchDisplayURL(stringReply(Method::fetchDisplayURL, message, peer));
 }
 
 void sendMessageWithDictionary(const Message& message, const Peer& peer, BodyReader& in) {
   Dictionary dictionary;
   in.readDictionary(dictionary);
   if (in.finish() != BodyStatus::ok) return;
-  ObjectReply answer;
+  ObjectReply objectReply;
   if (message.expectsReply()) {
-    answer = [reply = replyTo(message, peer)](const Value& object) mutable {
-      reply.answer("av", [&](MessageWriter& out) { out.writeOptionalValue(object); });
+    objectReply = [reply = replyTo(message, peer)](const Value& object) mutable {
+      answer(reply, Method::sendMessageWithDictionary,
+             [&](MessageWriter& out) { out.writeOptionalValue(object); });
     };
   }
-  peer.session.sendMessageWithDictionary(std::move(dictionary), std::move(answer));
+  peer.session.sendMessageWithDictionary(std::move(dictionary), std::move(objectReply));
 }
 
 void flushMessages(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() != BodyStatus::ok) return;
   peer.session.flushMessagesWithCompletion(
       [reply = replyTo(message, peer)](const Value& result, const std::optional<Error>& error) mutable {
-        reply.answer("ava(sis)", [&](MessageWriter& out) {
+        answer(reply, Method::flushMessagesWithCompletion, [&](MessageWriter& out) {
           out.writeOptionalValue(result);
           out.writeOptionalError(error);
         });
@@ -128,7 +141,8 @@ void uploadFile(const Message& message, const Peer& peer, BodyReader& in) {
   }
   peer.session.uploadFileAtPath(std::move(fileURL), std::move(token), std::move(extension),
                                 [reply = replyTo(message, peer)](bool success) mutable {
-                                  reply.answer("b", [&](MessageWriter& out) { out.writeBoolean(success); });
+                                  answer(reply, Method::uploadFileAtPath,
+                                         [&](MessageWriter& out) { out.writeBoolean(success); });
                                 });
 }
 
@@ -139,7 +153,7 @@ void uploadLogData(const Message& message, const Peer& peer, BodyReader& in) {
   peer.session.uploadLogData(
       std::move(logData),
       [reply = replyTo(message, peer)](bool success, const std::optional<Error>& error) mutable {
-        reply.answer("ba(sis)", [&](MessageWriter& out) {
+        answer(reply, Method::uploadLogData, [&](MessageWriter& out) {
           out.writeBoolean(success);
           out.writeOptionalError(error);
         });
@@ -157,7 +171,8 @@ void sendMessageWithSessionInfo(const Message& message, const Peer& peer, BodyRe
   in.readOptionalDictionary(payload);
   if (in.finish() != BodyStatus::ok) return;
   peer.session.sendMessageWithSessionInfo(std::move(sessionInfo), std::move(userInfo), category, type,
-                                          std::move(payload), stringReply(message, peer));
+                                          std::move(payload),
+                                          stringReply(Method::sendMessageWithSessionInfo, message, peer));
 }
 
 void updateSharedData(const Message& message, const Peer& peer, BodyReader& in) {
@@ -191,31 +206,31 @@ void setDigestKey(const Message& message, const Peer& peer, BodyReader& in) {
   reply.answerNothing();
 }
 
-struct Method {
-  std::string_view member, signature;
+struct Operation {
+  Method method;
   void (*call)(const Message&, const Peer&, BodyReader&);
 };
 
-// The most frequent first.
-constexpr Method kMethods[] = {
-    {"SendMessageWithDictionary", "a{sv}", sendMessageWithDictionary},
-    {"SetSessionInfo", "a{sv}aa{sv}avb", setSessionInfo},
-    {"StartConfigWithCompletionHandler", "", startConfig},
-    {"FetchStatesWithUserInfo", "aa{sv}", fetchStates},
-    {"FetchDisplayURL", "", fetchDisplayURL},
-    {"FlushMessagesWithCompletion", "", flushMessages},
-    {"FinishSessionGracefully", "", finishSessionGracefully},
-    {"UploadFileAtPath", "ssah", uploadFile},
-    {"UploadLogData", "av", uploadLogData},
-    {"SendMessageWithSessionInfo", "a{sv}aa{sv}qqaa{sv}", sendMessageWithSessionInfo},
-    {"UpdateSharedDataWithDictionary", "a{sv}", updateSharedData},
-    {"UpdateSharedDataForKey", "sav", updateSharedDataForKey},
-    {"SetDigestKey", "ayi", setDigestKey},
+constexpr std::array kOperations{
+    Operation{Method::sendMessageWithDictionary, sendMessageWithDictionary},
+    Operation{Method::setSessionInfo, setSessionInfo},
+    Operation{Method::startConfigWithCompletionHandler, startConfig},
+    Operation{Method::fetchStatesWithUserInfo, fetchStates},
+    Operation{Method::fetchDisplayURL, fetchDisplayURL},
+    Operation{Method::flushMessagesWithCompletion, flushMessages},
+    Operation{Method::finishSessionGracefully, finishSessionGracefully},
+    Operation{Method::uploadFileAtPath, uploadFile},
+    Operation{Method::uploadLogData, uploadLogData},
+    Operation{Method::sendMessageWithSessionInfo, sendMessageWithSessionInfo},
+    Operation{Method::updateSharedDataWithDictionary, updateSharedData},
+    Operation{Method::updateSharedDataForKey, updateSharedDataForKey},
+    Operation{Method::setDigestKey, setDigestKey},
 };
+static_assert(wire::standsInOrder(kOperations));
 
-const Method* methodNamed(std::string_view member) {
-  for (const Method& method : kMethods) {
-    if (method.member == member) return &method;
+const wire::MethodContract* methodNamed(std::string_view member) {
+  for (const wire::MethodContract& row : wire::kMethods) {
+    if (row.member == member) return &row;
   }
   return nullptr;
 }
@@ -269,10 +284,11 @@ const char* ClientSessionDispatcher::handle(const Message& message, const Peer& 
 
 const char* ClientSessionDispatcher::handleCall(const Message& message, const Peer& peer) const {
   const bool ours = message.interface == wire::kSessionInterface || message.interface.empty();
-  const Method* method = ours ? methodNamed(message.member) : nullptr;
+  const wire::MethodContract* method = ours ? methodNamed(message.member) : nullptr;
   if (method != nullptr && message.path == wire::kSessionPath) {
     BodyReader in(message);
-    if (in.hasSignature(method->signature)) method->call(message, peer, in);
+    if (in.hasSignature(method->signature))
+      kOperations[static_cast<size_t>(method->method)].call(message, peer, in);
     switch (in.finish()) {
       case BodyStatus::ok:
         return nullptr;

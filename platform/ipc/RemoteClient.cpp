@@ -1,6 +1,7 @@
 #include "platform/ipc/RemoteClient.h"
 
 #include "platform/base/Clock.h"
+#include "platform/ipc/Contract.h"
 #include "platform/queues/LineLimits.h"
 #include "platform/queues/Log.h"
 
@@ -16,8 +17,8 @@ std::optional<Error> RemoteClient::sendMessageToClient(std::optional<Dictionary>
       [&](MessageWriter& out, uint32_t serial) {
         out.beginCall(serial, {.path = wire::kClientPath,
                                .interface = wire::kReplyInterface,
-                               .member = "SendMessageToClient",
-                               .signature = "aa{sv}dqqaa{sv}",
+                               .member = wire::kSendMessageToClient,
+                               .signature = wire::kSendMessageToClientSignature,
                                .expectsReply = false});
         out.writeOptionalDictionary(sessionInfo);
         out.writeDouble(timestamp);
