@@ -8,8 +8,10 @@
 
 namespace kyt {
 
+using client::Answer;
+using client::Call;
 using client::Command;
-using Kind = client::Command::Kind;
+using client::Method;
 
 namespace {
 
@@ -35,21 +37,21 @@ std::string fileURL(const std::string& path) {
   return url;
 }
 
-// False, and its completion told, when a number is out of range.
-bool setMessage(Command& command, uint32_t category, uint32_t type) {
-  if ((category | type) > UINT16_MAX) {
-    command.fail(ClientError::invalid, client::outOfRange(category, type));
-    return false;
-  }
-  command.category = static_cast<uint16_t>(category);
-  command.type = static_cast<uint16_t>(type);
-  return true;
+// False, and `answer` told, when a number is out of range.
+bool inRange(uint32_t category, uint32_t type, Answer& answer) {
+  if ((category | type) <= UINT16_MAX) return true;
+  answer.fail(ClientError::invalid, client::outOfRange(category, type));
+  return false;
 }
 
 void chooseSocket(KYTReporting::Options& options) {
   if (!options.socketPath.empty()) return;
   const char* chosen = secure_getenv("KYTREPORTING_SOCKET");
   options.socketPath = chosen != nullptr && *chosen != '\0' ? chosen : kSocketPath;
+}
+
+std::unique_ptr<Command> command(Call call) {
+  return std::make_unique<Command>(std::move(call));
 }
 
 std::shared_ptr<client::Session> makeSession(KYTReporting::Options options, bool single) {
@@ -81,29 +83,23 @@ KYTReporting::~KYTReporting() {
   implementation_->session->close();
 }
 
-void KYTReporting::enqueue(std::unique_ptr<client::Command> command) {
+void KYTReporting::enqueue(std::unique_ptr<client::Command> given) {
   // Held here: the command's completion may destroy this object before the call below has returned.
   const std::shared_ptr<client::Session> session = implementation_->session;
-  session->enqueueCommand(std::move(command));
+  session->enqueueCommand(std::move(given));
 }
 
 void KYTReporting::startConfiguration(StatesCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::startConfiguration);
-  command->statesCompletion = std::move(completion);
-  enqueue(std::move(command));
+  enqueue(command({Method::startConfigWithCompletionHandler, {}, std::move(completion)}));
 }
 
 void KYTReporting::fetchStates(std::optional<Dictionary> userInfo, StatesCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::fetchStates);
-  command->dictionary = std::move(userInfo);
-  command->statesCompletion = std::move(completion);
-  enqueue(std::move(command));
+  enqueue(command({Method::fetchStatesWithUserInfo, client::UserInfoArguments{std::move(userInfo)},
+                   std::move(completion)}));
 }
 
 void KYTReporting::fetchDisplayURL(TextCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::fetchDisplayURL);
-  command->textCompletion = std::move(completion);
-  enqueue(std::move(command));
+  enqueue(command({Method::fetchDisplayURL, {}, std::move(completion)}));
 }
 
 bool KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag) {
@@ -112,59 +108,44 @@ bool KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payl
 
 void KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                                ObjectCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::messageWithReply);
-  command->flag = flag;
-  command->dictionary = std::move(payload);
-  command->objectCompletion = std::move(completion);
-  if (!setMessage(*command, category, type)) return;
-  enqueue(std::move(command));
+  Answer answer(std::move(completion));
+  if (!inRange(category, type, answer)) return;
+  client::MessageArguments message{static_cast<uint16_t>(category), static_cast<uint16_t>(type), flag,
+                                   std::move(payload)};
+  enqueue(command({Method::sendMessageWithDictionary, std::move(message), std::move(answer)}));
 }
 
 void KYTReporting::flush(ObjectCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::flush);
-  command->objectCompletion = std::move(completion);
-  enqueue(std::move(command));
+  enqueue(command({Method::flushMessagesWithCompletion, {}, std::move(completion)}));
 }
 
 void KYTReporting::updateSharedData(Dictionary entries) {
-  auto command = std::make_unique<Command>(Kind::updateSharedData);
-  command->dictionary = std::move(entries);
-  enqueue(std::move(command));
+  enqueue(command({Method::updateSharedDataWithDictionary, client::SharedDataArguments{std::move(entries)}}));
 }
 
 void KYTReporting::updateSharedData(String key, Value value) {
-  auto command = std::make_unique<Command>(Kind::updateSharedDataForKey);
-  command->text = std::move(key);
-  command->value = std::move(value);
-  enqueue(std::move(command));
+  enqueue(command(
+      {Method::updateSharedDataForKey, client::SharedDataForKeyArguments{std::move(key), std::move(value)}}));
 }
 
 void KYTReporting::setDigestKey(Data key, int32_t algorithm) {
-  auto command = std::make_unique<Command>(Kind::setDigestKey);
-  command->data = std::move(key);
-  command->algorithm = algorithm;
-  enqueue(std::move(command));
+  enqueue(command({Method::setDigestKey, client::DigestKeyArguments{std::move(key), algorithm}}));
 }
 
 void KYTReporting::uploadFile(const std::string& path, SuccessCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::uploadFile);
-  command->successCompletion = std::move(completion);
+  Answer answer(std::move(completion));
   const std::string absolute = linux_client::absolutePath(path);
   const linux_client::OpenedFile opened = linux_client::openFileAndFolder(absolute);
-  if (opened.file < 0) {
-    command->fail(ClientError::invalid, opened.error);
-    return;
-  }
-  command->text = fileURL(absolute);
-  command->descriptors = {opened.file, opened.folder};
-  enqueue(std::move(command));
+  if (opened.file < 0) return answer.fail(ClientError::invalid, opened.error);
+  client::UploadFileArguments upload{fileURL(absolute), {}};
+  for (const int descriptor : {opened.file, opened.folder})
+    upload.extension.emplace_back(descriptor, linux_client::closeDescriptor);
+  enqueue(command({Method::uploadFileAtPath, std::move(upload), std::move(answer)}));
 }
 
 void KYTReporting::uploadLogData(Array logData, SuccessCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::uploadLogData);
-  command->array = std::move(logData);
-  command->successCompletion = std::move(completion);
-  enqueue(std::move(command));
+  enqueue(command(
+      {Method::uploadLogData, client::UploadLogDataArguments{std::move(logData)}, std::move(completion)}));
 }
 
 bool KYTReporting::finish(std::chrono::milliseconds timeout) {
@@ -203,13 +184,15 @@ KYTReporting::Statistics KYTReporting::statistics() const {
 
 void KYTReporting::sendSingleMessage(Options options, uint32_t category, uint32_t type,
                                      std::optional<Dictionary> payload, TextCompletion completion) {
-  auto command = std::make_unique<Command>(Kind::singleMessage);
-  command->dictionary = std::move(payload);
-  command->textCompletion = std::move(completion);
-  if (!setMessage(*command, category, type)) return;
+  Answer answer(std::move(completion));
+  if (!inRange(category, type, answer)) return;
   options.onStateChange = nullptr;  // its context may be gone once the completion has run
+  client::SingleMessageArguments message{options.sessionInfo, options.userInfo,
+                                         static_cast<uint16_t>(category), static_cast<uint16_t>(type),
+                                         std::move(payload)};
   auto session = makeSession(std::move(options), true);
-  session->enqueueCommand(std::move(command));
+  session->enqueueCommand(
+      command({Method::sendMessageWithSessionInfo, std::move(message), std::move(answer)}));
   client::Loop::current()->add(session);
 }
 

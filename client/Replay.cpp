@@ -1,83 +1,71 @@
-// What a daemon is told first on each new connection. What does not fit into one message goes in pieces; what
-// cannot be sent is counted.
+#include "client/Replay.h"
+
 #include <utility>
 
-#include "client/Session.h"
 #include "client/WireSize.h"
 
 namespace kyt::client {
 
 namespace {
 
-using Kind = Command::Kind;
-
 constexpr size_t kPieceBytes = 256 * 1024;  // of shared data: well below what a message may have
+
+class Replay {
+ public:
+  Replay(const KeptState& kept, Function<bool(Call)> send) : kept_(kept), send_(std::move(send)) {}
+
+  Replayed run() {
+    if (!identity()) return {false, 0};
+    if (kept_.isConfigured()) (void)send_({Method::startConfigWithCompletionHandler});
+    sharedData();
+    if (kept_.digestKey()) count(send_({Method::setDigestKey, *kept_.digestKey()}));
+    return {true, failed_};
+  }
+
+ private:
+  void count(bool sent) { failed_ += sent ? 0 : 1; }
+
+  bool identity() {
+    if (send_({Method::setSessionInfo, kept_.identity()})) return true;
+    // Too large together?
+    IdentityArguments alone = kept_.identity();
+    UserInfoArguments userInfo{std::exchange(alone.userInfo, std::nullopt)};
+    if (!send_({Method::setSessionInfo, std::move(alone)})) return false;
+    count(send_({Method::fetchStatesWithUserInfo, std::move(userInfo)}));
+    return true;
+  }
+
+  void sharedData() {
+    Dictionary piece;
+    size_t bytes = 0;
+    for (const DictionaryEntry& entry : kept_.sharedData()) {
+      const size_t more = entryBytes(entry);
+      if (bytes > 0 && bytes + more > kPieceBytes) {
+        entries(std::exchange(piece, Dictionary()));
+        bytes = 0;
+      }
+      piece.append(entry.key, entry.value);
+      bytes += more;
+    }
+    if (!piece.empty()) entries(piece);
+  }
+
+  void entries(const Dictionary& piece) {
+    if (send_({Method::updateSharedDataWithDictionary, SharedDataArguments{piece}})) return;
+    // Larger than the estimate, or a value that only its own call has room for.
+    for (const DictionaryEntry& entry : piece)
+      count(send_({Method::updateSharedDataForKey, SharedDataForKeyArguments{entry.key, entry.value}}));
+  }
+
+  const KeptState& kept_;
+  Function<bool(Call)> send_;
+  uint64_t failed_ = 0;
+};
 
 }  // namespace
 
-void Session::replay() {
-  if (single_ || !replayIdentity()) return;
-  if (kept_.configured) (void)sendAgain(std::make_unique<Command>(Kind::startConfiguration));
-  replaySharedData();
-  if (!kept_.digestKey) return;
-  auto command = std::make_unique<Command>(Kind::setDigestKey);
-  command->data = *kept_.digestKey;
-  command->algorithm = kept_.digestAlgorithm;
-  if (!sendAgain(std::move(command))) replayFailed_.fetch_add(1);
-}
-
-// False when the daemon cannot be told who the session is: then nothing else may be sent, since the rules for
-// what it sends would not be known.
-bool Session::replayIdentity() {
-  if (encodeSessionInfo(kept_.userInfo)) return true;
-  if (!encodeSessionInfo(std::nullopt)) {
-    const std::string reason =
-        "the session's information cannot be sent: larger than a megabyte, or nested too deeply";
-    standing_.become(KYTReporting::State::refused, reason);
-    end(ClientError::invalid, reason);
-    return false;
-  }
-  // Too large together.
-  auto command = std::make_unique<Command>(Kind::fetchStates);
-  command->dictionary = kept_.userInfo;
-  if (!sendAgain(std::move(command))) replayFailed_.fetch_add(1);
-  return true;
-}
-
-bool Session::sendAgain(std::unique_ptr<Command> command) {
-  command->replayed = true;
-  const uint32_t serial = ++serial_;
-  if (!encodeCommand(*command, serial)) return false;
-  pending_.push_back({serial, std::move(command)});
-  return true;
-}
-
-void Session::replaySharedData() {
-  Dictionary piece;
-  size_t bytes = 0;
-  for (const DictionaryEntry& entry : kept_.sharedData) {
-    const size_t more = entryBytes(entry);
-    if (bytes > 0 && bytes + more > kPieceBytes) {
-      replayEntries(std::exchange(piece, Dictionary()));
-      bytes = 0;
-    }
-    piece.append(entry.key, entry.value);
-    bytes += more;
-  }
-  if (!piece.empty()) replayEntries(piece);
-}
-
-void Session::replayEntries(const Dictionary& entries) {
-  auto all = std::make_unique<Command>(Kind::updateSharedData);
-  all->dictionary = entries;
-  if (sendAgain(std::move(all))) return;
-  // Larger than the estimate, or a value that only its own call has room for.
-  for (const DictionaryEntry& entry : entries) {
-    auto one = std::make_unique<Command>(Kind::updateSharedDataForKey);
-    one->text = entry.key;
-    one->value = entry.value;
-    if (!sendAgain(std::move(one))) replayFailed_.fetch_add(1);
-  }
+Replayed replay(const KeptState& kept, Function<bool(Call)> send) {
+  return Replay(kept, std::move(send)).run();
 }
 
 }  // namespace kyt::client

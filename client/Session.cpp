@@ -43,10 +43,9 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
       loop_(loop),
       ring_(std::clamp<size_t>(options.maxQueuedMessages, 64, 65536)),
       standing_(nameOf(options.sessionInfo, single), std::move(options.onStateChange)),
+      kept_({std::move(options.sessionInfo), std::move(options.userInfo),
+             std::move(options.frameworksToCheck), static_cast<bool>(options.aggregationBlock)}),
       aggregationBlock_(std::move(options.aggregationBlock)) {
-  kept_.sessionInfo = std::move(options.sessionInfo);
-  kept_.userInfo = std::move(options.userInfo);
-  kept_.frameworks = std::move(options.frameworksToCheck);
   if (problem_.empty()) return;
   closed_ = true;
   standing_.become(KYTReporting::State::refused, problem_);
@@ -56,9 +55,7 @@ Session::~Session() {
   // Commands that were queued while the session ended.
   Item item;
   while (nextItem(item))
-    if (item.command) item.command->fail(ClientError::closed, "the session is closed");
-  for (const Mark& mark : marks_)
-    for (const int descriptor : mark.descriptors) linux_client::closeDescriptor(descriptor);
+    if (item.command) item.command->call.answer.fail(ClientError::closed, "the session is closed");
 }
 
 bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payload, uint32_t flag) {
@@ -72,12 +69,9 @@ bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payl
     return false;
   }
   Item item;
-  item.category = static_cast<uint16_t>(category);
-  item.type = static_cast<uint16_t>(type);
-  item.flag = flag;
   const size_t bytes = messageBytes(payload);
   item.bytes = static_cast<uint32_t>(std::min<size_t>(bytes, UINT32_MAX));
-  item.payload = std::move(payload);
+  item.message = {static_cast<uint16_t>(category), static_cast<uint16_t>(type), flag, std::move(payload)};
   const size_t before = queuedBytes_.fetch_add(item.bytes, std::memory_order_relaxed);
   const uint32_t counted = item.bytes;
   if (before + counted > maxQueuedBytes_ || overflowed_.load(std::memory_order_relaxed) > 0 ||
@@ -93,10 +87,11 @@ bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payl
 void Session::enqueueCommand(std::unique_ptr<Command> command) {
   if (refuses()) {
     const Error error = refusal();
-    command->fail(static_cast<ClientError>(error.code), error.localizedDescription);
+    command->call.answer.fail(static_cast<ClientError>(error.code), error.localizedDescription);
     return;
   }
-  if (callDeadline_.count() > 0 && command->kind != Command::Kind::finish && command->hasCompletion())
+  if (callDeadline_.count() > 0 && command->call.method != Method::finishSessionGracefully &&
+      command->call.answer.isAwaited())
     command->deadline = Steady::now() + callDeadline_;
   Item item;
   item.command = std::move(command);
@@ -108,7 +103,7 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
       overflowed_.fetch_add(1);
     }
   }
-  if (item.command) item.command->fail(ClientError::queueFull, "the queue is full");
+  if (item.command) item.command->call.answer.fail(ClientError::queueFull, "the queue is full");
   // NOLINTEND(bugprone-use-after-move)
   commandQueued_.store(true);
   loop_->noticeWork();
@@ -147,14 +142,13 @@ std::string Session::stateReason() const {
 
 bool Session::finishAndWait(milliseconds timeout) {
   if (refuses()) return false;
-  auto command = std::make_unique<Command>(Command::Kind::finish);
-  command->successCompletion = [this](bool success, std::optional<Error>) {
+  KYTReporting::SuccessCompletion said = [this](bool success, const std::optional<Error>&) {
     MutexLock lock(stateMutex_);
     finished_ = finished_ || success;  // a second goodbye that fails takes nothing back
     goodbyeOver_ = true;
     stateChanged_.notifyAll();
   };
-  enqueueCommand(std::move(command));
+  enqueueCommand(std::make_unique<Command>(Call{Method::finishSessionGracefully, {}, std::move(said)}));
   saidGoodbye_ = true;
   if (loop_->isCurrentThread()) return false;
   loop_->wake();  // without a daemon it gives up at once
@@ -200,13 +194,13 @@ void Session::end(ClientError code, const std::string& reason) {
   uint64_t lost = 0;
   for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
   unacknowledged_.clear();
-  std::vector<std::unique_ptr<Command>> commands;
-  for (Pending& entry : pending_) commands.push_back(std::move(entry.command));
+  std::vector<Answer> answers;
+  for (Pending& entry : pending_) answers.push_back(std::move(entry.command->call.answer));
   pending_.clear();
   Item item;
   while (nextItem(item)) {
     if (item.command)
-      commands.push_back(std::move(item.command));
+      answers.push_back(std::move(item.command->call.answer));
     else
       ++lost;
   }
@@ -214,7 +208,7 @@ void Session::end(ClientError code, const std::string& reason) {
   standing_.sayDrops(statistics());
   standing_.announce();
   standing_.dropBlock();
-  failAll(std::move(commands), code, reason);
+  failAll(std::move(answers), code, reason);
   aggregationBlock_ = nullptr;
   MutexLock lock(stateMutex_);
   goodbyeOver_ = true;
@@ -224,13 +218,12 @@ void Session::end(ClientError code, const std::string& reason) {
 
 // A completion may close the session: then the others have run before close() returns, and not with what the program
 // has freed by then.
-void Session::failAll(std::vector<std::unique_ptr<Command>> commands, ClientError code,
-                      const std::string& reason) {
-  for (auto& command : commands) failing_.push_back({std::move(command), code, reason});
+void Session::failAll(std::vector<Answer> answers, ClientError code, const std::string& reason) {
+  for (Answer& answer : answers) failing_.push_back({std::move(answer), code, reason});
   while (!failing_.empty()) {
-    const Failing failing = std::move(failing_.front());
+    Failing failing = std::move(failing_.front());
     failing_.pop_front();
-    failing.command->fail(failing.code, failing.reason);
+    failing.answer.fail(failing.code, failing.reason);
   }
 }
 
@@ -254,7 +247,7 @@ void Session::expire(SteadyTime now) {
   const bool looksAgain = commandQueued_.exchange(false);
   if (handshakeDone_ || (!looksAgain && now < nextExpiry_)) return;
   nextExpiry_ = SteadyTime::max();
-  std::vector<std::unique_ptr<Command>> late;
+  std::vector<Answer> late;
   const auto look = [&](const std::unique_ptr<Command>& command) {
     if (!command || !command->deadline) return;
     if (*command->deadline > now) {
@@ -263,7 +256,7 @@ void Session::expire(SteadyTime now) {
     }
     command->deadline.reset();
     command->given = command->staysGiven();
-    late.push_back(command->takeCompletions());
+    late.push_back(std::exchange(command->call.answer, {}));
   };
   ring_.forEach([&look](const Item& item) { look(item.command); });
   {

@@ -1,5 +1,5 @@
 // One session of the client library: the queue that the program's threads fill, and the connection that the
-// library's thread keeps for it. What must survive the daemon's death (Kept) is replayed on each new connection.
+// library's thread keeps for it. What must survive the daemon's death (KeptState) is replayed on each new connection.
 //
 // Threads: the operations under "any thread" only touch the ring, atomics and the overflow list; everything
 // else belongs to the library's thread (Loop).
@@ -12,7 +12,8 @@
 #include <optional>
 #include <string>
 
-#include "client/Kept.h"
+#include "client/Command.h"
+#include "client/KeptState.h"
 #include "client/MessageRing.h"
 #include "client/Standing.h"
 #include "platform/base/ConditionVariable.h"
@@ -27,8 +28,6 @@ struct Message;
 namespace kyt::client {
 
 class Loop;
-
-using SteadyTime = std::chrono::steady_clock::time_point;
 
 class Session {
  public:
@@ -69,11 +68,9 @@ class Session {
 
  private:
   struct Item {
-    uint16_t category = 0, type = 0;
-    uint32_t flag = 0;
-    uint32_t bytes = 0;  // what it counts for in queuedBytes_
-    Dictionary payload;
-    std::unique_ptr<Command> command;
+    MessageArguments message;
+    uint32_t bytes = 0;                // what it counts for in queuedBytes_
+    std::unique_ptr<Command> command;  // in place of a message
   };
   struct Pending {
     uint32_t serial = 0;
@@ -81,7 +78,7 @@ class Session {
   };
   struct Mark {  // descriptors that leave with the byte at this offset of out_
     size_t offset = 0;
-    std::vector<int> descriptors;
+    std::vector<Descriptor> descriptors;
   };
 
   [[nodiscard]] bool refuses() const {
@@ -95,7 +92,7 @@ class Session {
   bool move(SteadyTime now);
   void disconnected(SteadyTime now, std::string reason);
   [[nodiscard]] bool givesUp() const;
-  void failAll(std::vector<std::unique_ptr<Command>> commands, ClientError code, const std::string& reason);
+  void failAll(std::vector<Answer> answers, ClientError code, const std::string& reason);
   void expire(SteadyTime now);
   bool drain();
   void drainMessage(const Item& item);
@@ -112,17 +109,14 @@ class Session {
 
   // Encoding (Encoding.cpp): each appends one call to out_; false when it cannot be encoded.
   bool encodeMessage(const Item& item);
-  bool encodeCommand(Command& command, uint32_t serial);
-  bool encodeSessionInfo(const std::optional<Dictionary>& userInfo);
+  bool encodeCall(Call& given, uint32_t serial);
+  bool encodePing(uint32_t serial);
   void complete(Command& command, const Message& message);
-  void learnStates(const std::optional<Array>& names);
+  void learnStates(const StateNames& names);
 
-  // To a daemon that does not know the session yet (Replay.cpp).
-  void replay();
-  bool replayIdentity();
-  void replaySharedData();
-  void replayEntries(const Dictionary& entries);
-  bool sendAgain(std::unique_ptr<Command> command);
+  // To a daemon that does not know the session yet.
+  void tellAgain();
+  bool sendAgain(Call call);
 
   // Constant.
   const std::string problem_;  // of the session's information: nothing is sent
@@ -153,7 +147,7 @@ class Session {
   bool ended_ GUARDED_BY(stateMutex_) = false;        // nothing runs any more
 
   // The library's thread.
-  Kept kept_;
+  KeptState kept_;
   Function<void(const AggregatedMessage&)> aggregationBlock_;
   linux_client::ClientSocket socket_;
   ClientHandshake handshake_;
@@ -169,7 +163,7 @@ class Session {
   std::deque<Mark> marks_;
   std::deque<Pending> pending_;
   struct Failing {
-    std::unique_ptr<Command> command;
+    Answer answer;
     ClientError code;
     std::string reason;
   };
@@ -180,7 +174,7 @@ class Session {
     uint32_t count;
   };
   std::deque<Unacknowledged> unacknowledged_;  // messages by the serial up to which they go
-  bool pingOutstanding_ = false;
+  std::optional<uint32_t> ping_;               // the serial of one that is not answered
   SteadyTime lastPing_{}, nextAttempt_{};
   std::chrono::milliseconds backoff_{0};
 };

@@ -2,6 +2,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "client/Replay.h"
 #include "client/Session.h"
 #include "platform/ipc/MessageReader.h"
 
@@ -35,7 +36,7 @@ bool Session::hasWork() const {
 
 std::optional<SteadyTime> Session::nextDeadline() const {
   if (handshakeDone_) {
-    if (!unacknowledged_.empty() && !pingOutstanding_) return lastPing_ + kPingInterval;
+    if (!unacknowledged_.empty() && !ping_) return lastPing_ + kPingInterval;
     return std::nullopt;
   }
   const SteadyTime next = socket_.isOpen() ? nextExpiry_ : std::min(nextExpiry_, nextAttempt_);
@@ -125,13 +126,12 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   standing_.become(refused ? State::refused : State::noDaemon, reason);
   socket_.close();
   connected_ = false;
-  handshakeDone_ = pingOutstanding_ = false;
+  handshakeDone_ = false;
+  ping_.reset();
   commandQueued_ = true;  // deadlines count again
   in_.clear();
   out_.clear();
   outAt_ = 0;
-  for (const Mark& mark : marks_)
-    for (const int descriptor : mark.descriptors) linux_client::closeDescriptor(descriptor);
   marks_.clear();
   uint64_t lost = 0;
   for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
@@ -139,8 +139,8 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   lost_.fetch_add(lost);
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   nextAttempt_ = now + backoff_;
-  std::vector<std::unique_ptr<Command>> unanswered;
-  for (Pending& entry : pending_) unanswered.push_back(std::move(entry.command));
+  std::vector<Answer> unanswered;
+  for (Pending& entry : pending_) unanswered.push_back(std::move(entry.command->call.answer));
   pending_.clear();
   failAll(std::move(unanswered), ClientError::notConnected, reason);
   if (ending_ || (single_ && (taken || refused))) end(ClientError::notConnected, reason);
@@ -161,13 +161,13 @@ bool Session::drain() {
 
 void Session::drainMessage(const Item& item) {
   if (!encodeMessage(item)) {
-    standing_.say("message of category " + std::to_string(item.category) + ", type " +
-                  std::to_string(item.type) + ": larger than a megabyte, or nested too deeply");
+    standing_.say("message of category " + std::to_string(item.message.category) + ", type " +
+                  std::to_string(item.message.type) + ": larger than a megabyte, or nested too deeply");
     droppedInvalid_.fetch_add(1);
     return;
   }
   sent_.fetch_add(1, std::memory_order_relaxed);
-  if (!kept_.configured && sentUnconfigured_.fetch_add(1, std::memory_order_relaxed) == 0)
+  if (!kept_.isConfigured() && sentUnconfigured_.fetch_add(1, std::memory_order_relaxed) == 0)
     standing_.become(State::connected,
                      "messages are sent, and startConfiguration was not called: the daemon drops them");
   if (unacknowledged_.empty() || unacknowledged_.back().serial != serial_ - 1)
@@ -178,15 +178,16 @@ void Session::drainMessage(const Item& item) {
 
 void Session::drainCommand(std::unique_ptr<Command> command) {
   if (!command->given) return;
-  if (command->kind == Command::Kind::finish) ending_ = true;
+  Call& call = command->call;
+  if (call.method == Method::finishSessionGracefully) ending_ = true;
   const uint32_t serial = ++serial_;
-  if (!encodeCommand(*command, serial)) {
+  if (!encodeCall(call, serial)) {
     droppedInvalid_.fetch_add(1);
-    command->fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
+    call.answer.fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
     return;
   }
-  kept_.takeOver(*command);
-  if (command->kind == Command::Kind::startConfiguration && standing_.state() == State::connected)
+  kept_.takeOver(call);
+  if (call.method == Method::startConfigWithCompletionHandler && standing_.state() == State::connected)
     standing_.note(State::connected, reasonOfConnected(true));
   pending_.push_back({serial, std::move(command)});
 }
@@ -194,10 +195,11 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
 bool Session::write(SteadyTime now) {
   bool any = false;
   while (wantsToWrite()) {
-    std::vector<int> descriptors;
+    std::vector<int> descriptors;  // of the mark, which owns them until they have left
     size_t end = out_.size();
     const bool marked = !marks_.empty() && marks_.front().offset == outAt_;
-    if (marked) descriptors = marks_.front().descriptors;
+    if (marked)
+      for (const Descriptor& descriptor : marks_.front().descriptors) descriptors.push_back(descriptor.get());
     const size_t next = marked ? 1 : 0;
     if (marks_.size() > next) end = marks_[next].offset;
     size_t written = 0;
@@ -209,10 +211,7 @@ bool Session::write(SteadyTime now) {
       if (!done_ && socket_.isOpen()) disconnected(now, "the connection ended");
       return any;
     }
-    if (marked) {
-      for (const int descriptor : descriptors) linux_client::closeDescriptor(descriptor);
-      marks_.pop_front();
-    }
+    if (marked) marks_.pop_front();
     outAt_ += written;
     any = true;
   }
@@ -222,12 +221,10 @@ bool Session::write(SteadyTime now) {
 }
 
 void Session::pingIfDue(SteadyTime now) {
-  if (unacknowledged_.empty() || pingOutstanding_ || now - lastPing_ < kPingInterval) return;
-  auto ping = std::make_unique<Command>(Command::Kind::ping);
+  if (unacknowledged_.empty() || ping_ || now - lastPing_ < kPingInterval) return;
   const uint32_t serial = ++serial_;
-  if (!encodeCommand(*ping, serial)) return;
-  pending_.push_back({serial, std::move(ping)});
-  pingOutstanding_ = true;
+  if (!encodePing(serial)) return;
+  ping_ = serial;
   lastPing_ = now;
 }
 
@@ -260,9 +257,29 @@ const char* Session::readHandshake(size_t& at) {
   endedInHandshake_ = 0;
   connected_.store(true, std::memory_order_seq_cst);
   backoff_ = milliseconds(0);
-  standing_.become(State::connected, reasonOfConnected(kept_.configured));
-  replay();
+  standing_.become(State::connected, reasonOfConnected(kept_.isConfigured()));
+  if (!single_) tellAgain();
   return nullptr;
+}
+
+void Session::tellAgain() {
+  const Replayed told = replay(kept_, [this](Call call) { return sendAgain(std::move(call)); });
+  replayFailed_.fetch_add(told.failed);
+  if (told.identified) return;
+  const std::string reason =
+      "the session's information cannot be sent: larger than a megabyte, or nested too deeply";
+  standing_.become(State::refused, reason);
+  end(ClientError::invalid, reason);
+}
+
+bool Session::sendAgain(Call call) {
+  const uint32_t serial = ++serial_;
+  if (!encodeCall(call, serial)) return false;
+  if (call.method == Method::setSessionInfo) return true;  // one way
+  auto command = std::make_unique<Command>(std::move(call));
+  command->replayed = true;
+  pending_.push_back({serial, std::move(command)});
+  return true;
 }
 
 const char* Session::readMessages(size_t& at) {
@@ -298,6 +315,11 @@ void Session::acknowledge(uint32_t serial) {
 }
 
 void Session::handleReply(const Message& message) {
+  if (ping_ == message.replySerial) {
+    acknowledge(message.replySerial);
+    ping_.reset();
+    return;
+  }
   const auto found = std::find_if(pending_.begin(), pending_.end(), [&message](const Pending& entry) {
     return entry.serial == message.replySerial;
   });
@@ -305,11 +327,7 @@ void Session::handleReply(const Message& message) {
   acknowledge(message.replySerial);
   std::unique_ptr<Command> command = std::move(found->command);
   pending_.erase(found);
-  if (command->kind == Command::Kind::ping) {
-    pingOutstanding_ = false;
-    return;
-  }
-  const bool last = command->kind == Command::Kind::finish || single_;
+  const bool last = command->call.method == Method::finishSessionGracefully || single_;
   complete(*command, message);
   if (last) end(ClientError::closed, "the session was closed");
 }

@@ -5,7 +5,7 @@
 #include <string>
 #include <utility>
 
-#include "client/Command.h"
+#include "client/Answer.h"
 #include "platform/base/TextEscape.h"
 #include "platform/objects/SessionInfoKeys.h"
 

@@ -1,8 +1,10 @@
 // What a daemon that comes back is told again.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <future>
 
+#include "client/Replay.h"
 #include "kytreporting/KYTReporting.h"
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
@@ -46,6 +48,70 @@ class ClientReplay : public testing::Test {
   const std::string socket_ = folder_ / "socket";
   TestDaemon daemon_{socket_};
 };
+
+// What is told of a state, by a sender that refuses calls of these methods.
+struct Told {
+  std::vector<std::string> calls;
+  client::Replayed result;
+};
+Told told(const client::KeptState& kept, const std::vector<wire::Method>& refused = {},
+          bool alsoAlone = false) {
+  Told all;
+  all.result = client::replay(kept, [&](client::Call call) {
+    const auto* identity = std::get_if<client::IdentityArguments>(&call.arguments);
+    const bool alone = identity != nullptr && !identity->userInfo;
+    if (std::find(refused.begin(), refused.end(), call.method) != refused.end() && (!alone || alsoAlone))
+      return false;
+    all.calls.emplace_back(wire::contractOf(call.method).member);
+    return true;
+  });
+  return all;
+}
+
+client::KeptState everythingKept() {
+  client::KeptState kept({{}, Dictionary{{"ClientName", "n"}}, {}, false});
+  kept.takeOver({wire::Method::startConfigWithCompletionHandler});
+  kept.takeOver(
+      {wire::Method::updateSharedDataWithDictionary, client::SharedDataArguments{{{"a", 1}, {"b", 2}}}});
+  kept.takeOver({wire::Method::setDigestKey, client::DigestKeyArguments{Data("key"), 1}});
+  return kept;
+}
+
+TEST(Replay, TellsWhoTheSessionIsFirstAndThenWhatItSaid) {
+  const Told all = told(everythingKept());
+  EXPECT_EQ(all.calls, (std::vector<std::string>{"SetSessionInfo", "StartConfigWithCompletionHandler",
+                                                 "UpdateSharedDataWithDictionary", "SetDigestKey"}));
+  EXPECT_TRUE(all.result.identified);
+  EXPECT_EQ(all.result.failed, 0U);
+}
+
+TEST(Replay, TellsOfANewSessionOnlyWhoItIs) {
+  EXPECT_EQ(told(client::KeptState({})).calls, std::vector<std::string>{"SetSessionInfo"});
+}
+
+TEST(Replay, TellsInSmallerPiecesWhatCannotBeSentAtOnce) {
+  const Told all =
+      told(everythingKept(), {wire::Method::setSessionInfo, wire::Method::updateSharedDataWithDictionary});
+  EXPECT_EQ(all.calls, (std::vector<std::string>{"SetSessionInfo", "FetchStatesWithUserInfo",
+                                                 "StartConfigWithCompletionHandler", "UpdateSharedDataForKey",
+                                                 "UpdateSharedDataForKey", "SetDigestKey"}));
+  EXPECT_EQ(all.result.failed, 0U);
+}
+
+TEST(Replay, CountsEachValueThatCannotBeSent) {
+  const Told all =
+      told(everythingKept(), {wire::Method::setSessionInfo, wire::Method::fetchStatesWithUserInfo,
+                              wire::Method::updateSharedDataWithDictionary,
+                              wire::Method::updateSharedDataForKey, wire::Method::setDigestKey});
+  EXPECT_TRUE(all.result.identified);
+  EXPECT_EQ(all.result.failed, 4U);
+}
+
+TEST(Replay, TellsNothingWhenItCannotSayWhoTheSessionIs) {
+  const Told all = told(everythingKept(), {wire::Method::setSessionInfo}, true);
+  EXPECT_FALSE(all.result.identified);
+  EXPECT_EQ(all.calls, std::vector<std::string>());
+}
 
 TEST_F(ClientReplay, SendsSharedDataOfMoreThanOneMessageInPieces) {
   ASSERT_TRUE(daemon_.start());
