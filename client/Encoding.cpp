@@ -20,12 +20,12 @@ MessageWriter::Call callOf(Method method) {
 
 }  // namespace
 
-bool Session::encodeMessage(const Item& item) {
+bool Session::encodeMessage(const MessageArguments& message) {
   MessageWriter writer(out_, kMaxCallBytes);
   MessageWriter::Call call = callOf(Method::sendMessageWithDictionary);
   call.expectsReply = false;
   writer.beginCall(++serial_, call);
-  writeArguments(writer, item.message);
+  writeArguments(writer, message);
   return writer.end();
 }
 
@@ -58,7 +58,7 @@ void Session::complete(Command& command, const Message& message) {
   if (message.type == wire::MessageType::error) {
     const std::string text = daemonError(message).localizedDescription;
     standing_.say(std::string(wire::contractOf(method).member) + ": " + text);
-    if (command.replayed) replayFailed_.fetch_add(1);
+    if (command.replayed) figures_.replayFailed.add();
     command.call.answer.fail(ClientError::refused, text);
     return;
   }

@@ -5,7 +5,6 @@
 #include <utility>
 
 #include "client/Loop.h"
-#include "client/WireSize.h"
 
 namespace kyt::client {
 
@@ -14,7 +13,6 @@ namespace {
 using std::chrono::milliseconds;
 using Steady = std::chrono::steady_clock;
 
-constexpr size_t kMaxOverflow = 4096;                          // commands
 constexpr milliseconds kLongestWait = std::chrono::years(50);  // a clock's nanoseconds end soon after 200
 
 std::string problemOf(const Dictionary& sessionInfo) {
@@ -37,11 +35,10 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
     : problem_(problemOf(options.sessionInfo)),
       path_(std::move(options.socketPath)),
       single_(single),
-      maxQueuedBytes_(std::max<size_t>(options.maxQueuedBytes, 4096)),
       callDeadline_(std::min(options.callDeadline, kLongestWait)),
       finishWaitsForDaemon_(options.finishWaitsForDaemon),
       loop_(loop),
-      ring_(std::clamp<size_t>(options.maxQueuedMessages, 64, 65536)),
+      queue_(options.maxQueuedMessages, options.maxQueuedBytes),
       standing_(nameOf(options.sessionInfo, single), std::move(options.onStateChange)),
       kept_({std::move(options.sessionInfo), std::move(options.userInfo),
              std::move(options.frameworksToCheck), static_cast<bool>(options.aggregationBlock)}),
@@ -54,30 +51,23 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
 Session::~Session() {
   // Commands that were queued while the session ended.
   Item item;
-  while (nextItem(item))
+  while (queue_.pop(item))
     if (item.command) item.command->call.answer.fail(ClientError::closed, "the session is closed");
 }
 
 bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payload, uint32_t flag) {
   if ((category | type) > UINT16_MAX) {
     standing_.say("message of " + outOfRange(category, type));
-    droppedInvalid_.fetch_add(1, std::memory_order_relaxed);
+    figures_.droppedInvalid.add();
     return false;
   }
   if (refuses()) {
-    (problem_.empty() ? droppedClosed_ : droppedInvalid_).fetch_add(1, std::memory_order_relaxed);
+    (problem_.empty() ? figures_.droppedClosed : figures_.droppedInvalid).add();
     return false;
   }
-  Item item;
-  const size_t bytes = messageBytes(payload);
-  item.bytes = static_cast<uint32_t>(std::min<size_t>(bytes, UINT32_MAX));
-  item.message = {static_cast<uint16_t>(category), static_cast<uint16_t>(type), flag, std::move(payload)};
-  const size_t before = queuedBytes_.fetch_add(item.bytes, std::memory_order_relaxed);
-  const uint32_t counted = item.bytes;
-  if (before + counted > maxQueuedBytes_ || overflowed_.load(std::memory_order_relaxed) > 0 ||
-      !ring_.push(std::move(item))) {
-    queuedBytes_.fetch_sub(counted, std::memory_order_relaxed);
-    droppedQueueFull_.fetch_add(1, std::memory_order_relaxed);
+  if (!queue_.pushMessage(
+          {static_cast<uint16_t>(category), static_cast<uint16_t>(type), flag, std::move(payload)})) {
+    figures_.droppedQueueFull.add();
     return false;
   }
   noticeWork();
@@ -93,19 +83,8 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
   if (callDeadline_.count() > 0 && command->call.method != Method::finishSessionGracefully &&
       command->call.answer.isAwaited())
     command->deadline = Steady::now() + callDeadline_;
-  Item item;
-  item.command = std::move(command);
-  // NOLINTBEGIN(bugprone-use-after-move): push() leaves what it refuses.
-  if (overflowed_.load() > 0 || !ring_.push(std::move(item))) {
-    MutexLock lock(overflowMutex_);
-    if (overflow_.size() < kMaxOverflow) {
-      overflow_.push_back(std::move(item.command));
-      overflowed_.fetch_add(1);
-    }
-  }
-  if (item.command) item.command->call.answer.fail(ClientError::queueFull, "the queue is full");
-  // NOLINTEND(bugprone-use-after-move)
-  commandQueued_.store(true);
+  command = queue_.pushCommand(std::move(command));
+  if (command) command->call.answer.fail(ClientError::queueFull, "the queue is full");
   loop_->noticeWork();
 }
 
@@ -121,18 +100,7 @@ void Session::noticeWork() {
 }
 
 KYTReporting::Statistics Session::statistics() const {
-  KYTReporting::Statistics figures;
-  figures.sent = sent_.load(std::memory_order_relaxed);
-  figures.droppedQueueFull = droppedQueueFull_.load(std::memory_order_relaxed);
-  figures.lostOnConnectionEnd = lost_.load(std::memory_order_relaxed);
-  figures.droppedClosed = droppedClosed_.load(std::memory_order_relaxed);
-  figures.droppedInvalid = droppedInvalid_.load(std::memory_order_relaxed);
-  figures.connections = connections_.load(std::memory_order_relaxed);
-  figures.queued = ring_.size() + overflowed_.load(std::memory_order_relaxed);
-  figures.waitedTooLong = waitedTooLong_.load(std::memory_order_relaxed);
-  figures.replayFailed = replayFailed_.load(std::memory_order_relaxed);
-  figures.sentUnconfigured = sentUnconfigured_.load(std::memory_order_relaxed);
-  return figures;
+  return figures_.statistics(queue_.size());
 }
 
 std::string Session::stateReason() const {
@@ -198,13 +166,13 @@ void Session::end(ClientError code, const std::string& reason) {
   for (Pending& entry : pending_) answers.push_back(std::move(entry.command->call.answer));
   pending_.clear();
   Item item;
-  while (nextItem(item)) {
+  while (queue_.pop(item)) {
     if (item.command)
       answers.push_back(std::move(item.command->call.answer));
     else
       ++lost;
   }
-  lost_.fetch_add(lost);
+  figures_.lostOnConnectionEnd.add(lost);
   standing_.sayDrops(statistics());
   standing_.announce();
   standing_.dropBlock();
@@ -227,44 +195,12 @@ void Session::failAll(std::vector<Answer> answers, ClientError code, const std::
   }
 }
 
-bool Session::nextItem(Item& item) {
-  if (ring_.pop(item)) {
-    queuedBytes_.fetch_sub(item.bytes, std::memory_order_relaxed);
-    return true;
-  }
-  if (overflowed_.load() == 0) return false;
-  MutexLock lock(overflowMutex_);
-  if (overflow_.empty()) return false;
-  item = Item();
-  item.command = std::move(overflow_.front());
-  overflow_.pop_front();
-  overflowed_.fetch_sub(1);
-  return true;
-}
-
-// Completions that waited too long for a daemon get an error. Their commands stay where they stand in the queue.
+// Completions that waited too long for a daemon get an error.
 void Session::expire(SteadyTime now) {
-  const bool looksAgain = commandQueued_.exchange(false);
-  if (handshakeDone_ || (!looksAgain && now < nextExpiry_)) return;
-  nextExpiry_ = SteadyTime::max();
-  std::vector<Answer> late;
-  const auto look = [&](const std::unique_ptr<Command>& command) {
-    if (!command || !command->deadline) return;
-    if (*command->deadline > now) {
-      nextExpiry_ = std::min(nextExpiry_, *command->deadline);
-      return;
-    }
-    command->deadline.reset();
-    command->given = command->staysGiven();
-    late.push_back(std::exchange(command->call.answer, {}));
-  };
-  ring_.forEach([&look](const Item& item) { look(item.command); });
-  {
-    MutexLock lock(overflowMutex_);
-    for (const auto& command : overflow_) look(command);
-  }
+  if (handshakeDone_) return queue_.suspendDeadlines();
+  std::vector<Answer> late = queue_.takeExpired(now);
   if (late.empty()) return;
-  waitedTooLong_.fetch_add(late.size());
+  figures_.waitedTooLong.add(late.size());
   const std::string reason = "no daemon within " + secondsText(callDeadline_) + ": " + standing_.why();
   failAll(std::move(late), ClientError::timedOut, reason);
   // Nothing is left of it but a connection, which would keep the daemon from its idle end.

@@ -1,7 +1,7 @@
 // One session of the client library: the queue that the program's threads fill, and the connection that the
 // library's thread keeps for it. What must survive the daemon's death (KeptState) is replayed on each new connection.
 //
-// Threads: the operations under "any thread" only touch the ring, atomics and the overflow list; everything
+// Threads: the operations under "any thread" only touch the queue, the figures and atomics; everything
 // else belongs to the library's thread (Loop).
 #pragma once
 
@@ -13,8 +13,9 @@
 #include <string>
 
 #include "client/Command.h"
+#include "client/Figures.h"
 #include "client/KeptState.h"
-#include "client/MessageRing.h"
+#include "client/OutgoingQueue.h"
 #include "client/Standing.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
@@ -67,11 +68,7 @@ class Session {
   void end(ClientError code, const std::string& reason);  // every completion runs
 
  private:
-  struct Item {
-    MessageArguments message;
-    uint32_t bytes = 0;                // what it counts for in queuedBytes_
-    std::unique_ptr<Command> command;  // in place of a message
-  };
+  using Item = OutgoingQueue::Item;
   struct Pending {
     uint32_t serial = 0;
     std::unique_ptr<Command> command;
@@ -95,9 +92,8 @@ class Session {
   void failAll(std::vector<Answer> answers, ClientError code, const std::string& reason);
   void expire(SteadyTime now);
   bool drain();
-  void drainMessage(const Item& item);
+  void drainMessage(const MessageArguments& message);
   void drainCommand(std::unique_ptr<Command> command);
-  bool nextItem(Item& item);
   bool write(SteadyTime now);
   void pingIfDue(SteadyTime now);
   [[nodiscard]] const char* readHandshake(size_t& at);
@@ -108,7 +104,7 @@ class Session {
   void acknowledge(uint32_t serial);
 
   // Encoding (Encoding.cpp): each appends one call to out_; false when it cannot be encoded.
-  bool encodeMessage(const Item& item);
+  bool encodeMessage(const MessageArguments& message);
   bool encodeCall(Call& given, uint32_t serial);
   bool encodePing(uint32_t serial);
   void complete(Command& command, const Message& message);
@@ -122,24 +118,16 @@ class Session {
   const std::string problem_;  // of the session's information: nothing is sent
   const std::string path_;
   const bool single_;
-  const size_t maxQueuedBytes_;
   const std::chrono::milliseconds callDeadline_;
   const bool finishWaitsForDaemon_;
   Loop* const loop_;
 
   // Any thread.
-  MessageRing<Item> ring_;
-  std::atomic<size_t> queuedBytes_{0};
+  OutgoingQueue queue_;
+  Figures figures_;
   std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
-  std::atomic<bool> unserved_{false};       // there was no thread for it
-  std::atomic<bool> commandQueued_{false};  // since the deadlines were last looked at
-  std::atomic<uint64_t> sent_{0}, droppedQueueFull_{0}, lost_{0}, droppedClosed_{0}, droppedInvalid_{0},
-      connections_{0}, waitedTooLong_{0}, replayFailed_{0}, sentUnconfigured_{0};
+  std::atomic<bool> unserved_{false};  // there was no thread for it
   Standing standing_;
-  Mutex overflowMutex_;
-  // Commands that found the ring full.
-  std::deque<std::unique_ptr<Command>> overflow_ GUARDED_BY(overflowMutex_);
-  std::atomic<size_t> overflowed_{0};
   Mutex stateMutex_;
   ConditionVariable stateChanged_;
   bool finished_ GUARDED_BY(stateMutex_) = false;     // the goodbye was answered
@@ -157,7 +145,6 @@ class Session {
   bool daemonEnds_ = false;        // it said so in the handshake
   bool triedAtGoodbye_ = false;    // the last attempt before giving up
   unsigned endedInHandshake_ = 0;  // connections in a row
-  SteadyTime nextExpiry_ = SteadyTime::max();
   std::string in_, out_;
   size_t outAt_ = 0;
   std::deque<Mark> marks_;

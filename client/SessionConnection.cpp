@@ -30,8 +30,7 @@ const char* reasonOfConnected(bool configured) {
 }  // namespace
 
 bool Session::hasWork() const {
-  return closed_.load() || commandQueued_.load() ||
-         ((!ring_.empty() || overflowed_.load() > 0) && handshakeDone_);
+  return closed_.load() || queue_.hasNewCommand() || (handshakeDone_ && !queue_.isEmpty());
 }
 
 std::optional<SteadyTime> Session::nextDeadline() const {
@@ -39,7 +38,8 @@ std::optional<SteadyTime> Session::nextDeadline() const {
     if (!unacknowledged_.empty() && !ping_) return lastPing_ + kPingInterval;
     return std::nullopt;
   }
-  const SteadyTime next = socket_.isOpen() ? nextExpiry_ : std::min(nextExpiry_, nextAttempt_);
+  const SteadyTime next =
+      socket_.isOpen() ? queue_.nextDeadline() : std::min(queue_.nextDeadline(), nextAttempt_);
   if (next == SteadyTime::max()) return std::nullopt;
   return next;
 }
@@ -99,7 +99,7 @@ void Session::connect(SteadyTime now) {
     return;
   }
   socket_ = std::move(made);
-  connections_.fetch_add(1);
+  figures_.connections.add();
   handshake_ = ClientHandshake();
   handshakeDone_ = false;
   out_ = ClientHandshake::opening(linux_client::effectiveUser());
@@ -128,7 +128,7 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   connected_ = false;
   handshakeDone_ = false;
   ping_.reset();
-  commandQueued_ = true;  // deadlines count again
+  queue_.lookAgain();  // deadlines count again
   in_.clear();
   out_.clear();
   outAt_ = 0;
@@ -136,7 +136,7 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   uint64_t lost = 0;
   for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
   unacknowledged_.clear();
-  lost_.fetch_add(lost);
+  figures_.lostOnConnectionEnd.add(lost);
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   nextAttempt_ = now + backoff_;
   std::vector<Answer> unanswered;
@@ -149,25 +149,25 @@ void Session::disconnected(SteadyTime now, std::string reason) {
 bool Session::drain() {
   bool any = false;
   Item item;
-  while (out_.size() - outAt_ < kWriteAhead && !ending_ && nextItem(item)) {
+  while (out_.size() - outAt_ < kWriteAhead && !ending_ && queue_.pop(item)) {
     any = true;
     if (item.command)
       drainCommand(std::move(item.command));
     else
-      drainMessage(item);
+      drainMessage(item.message);
   }
   return any;
 }
 
-void Session::drainMessage(const Item& item) {
-  if (!encodeMessage(item)) {
-    standing_.say("message of category " + std::to_string(item.message.category) + ", type " +
-                  std::to_string(item.message.type) + ": larger than a megabyte, or nested too deeply");
-    droppedInvalid_.fetch_add(1);
+void Session::drainMessage(const MessageArguments& message) {
+  if (!encodeMessage(message)) {
+    standing_.say("message of category " + std::to_string(message.category) + ", type " +
+                  std::to_string(message.type) + ": larger than a megabyte, or nested too deeply");
+    figures_.droppedInvalid.add();
     return;
   }
-  sent_.fetch_add(1, std::memory_order_relaxed);
-  if (!kept_.isConfigured() && sentUnconfigured_.fetch_add(1, std::memory_order_relaxed) == 0)
+  figures_.sent.add();
+  if (!kept_.isConfigured() && figures_.sentUnconfigured.add() == 0)
     standing_.become(State::connected,
                      "messages are sent, and startConfiguration was not called: the daemon drops them");
   if (unacknowledged_.empty() || unacknowledged_.back().serial != serial_ - 1)
@@ -182,7 +182,7 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
   if (call.method == Method::finishSessionGracefully) ending_ = true;
   const uint32_t serial = ++serial_;
   if (!encodeCall(call, serial)) {
-    droppedInvalid_.fetch_add(1);
+    figures_.droppedInvalid.add();
     call.answer.fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
     return;
   }
@@ -264,7 +264,7 @@ const char* Session::readHandshake(size_t& at) {
 
 void Session::tellAgain() {
   const Replayed told = replay(kept_, [this](Call call) { return sendAgain(std::move(call)); });
-  replayFailed_.fetch_add(told.failed);
+  figures_.replayFailed.add(told.failed);
   if (told.identified) return;
   const std::string reason =
       "the session's information cannot be sent: larger than a megabyte, or nested too deeply";
