@@ -16,6 +16,7 @@
 #include "client/Figures.h"
 #include "client/KeptState.h"
 #include "client/OutgoingQueue.h"
+#include "client/Output.h"
 #include "client/Standing.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
@@ -62,7 +63,7 @@ class Session {
   [[nodiscard]] bool hasWork() const;
   [[nodiscard]] bool isDone() const { return done_; }
   [[nodiscard]] int fd() const { return socket_.fd(); }
-  [[nodiscard]] bool wantsToWrite() const { return outAt_ < out_.size(); }
+  [[nodiscard]] bool wantsToWrite() const { return output_.waiting() > 0; }
   // When pump() has something to do without being told, or none.
   [[nodiscard]] std::optional<SteadyTime> nextDeadline() const;
   void end(ClientError code, const std::string& reason);  // every completion runs
@@ -72,10 +73,6 @@ class Session {
   struct Pending {
     uint32_t serial = 0;
     std::unique_ptr<Command> command;
-  };
-  struct Mark {  // descriptors that leave with the byte at this offset of out_
-    size_t offset = 0;
-    std::vector<Descriptor> descriptors;
   };
 
   [[nodiscard]] bool refuses() const {
@@ -102,11 +99,6 @@ class Session {
   void handleReply(const Message& message);
   void handleCall(const Message& message);
   void acknowledge(uint32_t serial);
-
-  // Encoding (Encoding.cpp): each appends one call to out_; false when it cannot be encoded.
-  bool encodeMessage(const MessageArguments& message);
-  bool encodeCall(Call& given, uint32_t serial);
-  bool encodePing(uint32_t serial);
   void complete(Command& command, const Message& message);
   void learnStates(const StateNames& names);
 
@@ -145,9 +137,8 @@ class Session {
   bool daemonEnds_ = false;        // it said so in the handshake
   bool triedAtGoodbye_ = false;    // the last attempt before giving up
   unsigned endedInHandshake_ = 0;  // connections in a row
-  std::string in_, out_;
-  size_t outAt_ = 0;
-  std::deque<Mark> marks_;
+  std::string in_;
+  Output output_;
   std::deque<Pending> pending_;
   struct Failing {
     Answer answer;
@@ -155,7 +146,6 @@ class Session {
     std::string reason;
   };
   std::deque<Failing> failing_;  // whose completions run now
-  uint32_t serial_ = 0;
   struct Unacknowledged {
     uint32_t serial;
     uint32_t count;

@@ -4,6 +4,7 @@
 
 #include "client/Replay.h"
 #include "client/Session.h"
+#include "platform/ipc/BodyReader.h"
 #include "platform/ipc/MessageReader.h"
 
 namespace kyt::client {
@@ -102,8 +103,7 @@ void Session::connect(SteadyTime now) {
   figures_.connections.add();
   handshake_ = ClientHandshake();
   handshakeDone_ = false;
-  out_ = ClientHandshake::opening(linux_client::effectiveUser());
-  outAt_ = 0;
+  output_.restart(ClientHandshake::opening(linux_client::effectiveUser()));
   if (standing_.state() == State::noDaemon)
     standing_.note(State::noDaemon, path_ + ": the daemon has not answered yet");
 }
@@ -130,9 +130,7 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   ping_.reset();
   queue_.lookAgain();  // deadlines count again
   in_.clear();
-  out_.clear();
-  outAt_ = 0;
-  marks_.clear();
+  output_.restart();
   uint64_t lost = 0;
   for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
   unacknowledged_.clear();
@@ -149,7 +147,7 @@ void Session::disconnected(SteadyTime now, std::string reason) {
 bool Session::drain() {
   bool any = false;
   Item item;
-  while (out_.size() - outAt_ < kWriteAhead && !ending_ && queue_.pop(item)) {
+  while (output_.waiting() < kWriteAhead && !ending_ && queue_.pop(item)) {
     any = true;
     if (item.command)
       drainCommand(std::move(item.command));
@@ -160,7 +158,8 @@ bool Session::drain() {
 }
 
 void Session::drainMessage(const MessageArguments& message) {
-  if (!encodeMessage(message)) {
+  const std::optional<uint32_t> serial = output_.message(message);
+  if (!serial) {
     standing_.say("message of category " + std::to_string(message.category) + ", type " +
                   std::to_string(message.type) + ": larger than a megabyte, or nested too deeply");
     figures_.droppedInvalid.add();
@@ -170,9 +169,9 @@ void Session::drainMessage(const MessageArguments& message) {
   if (!kept_.isConfigured() && figures_.sentUnconfigured.add() == 0)
     standing_.become(State::connected,
                      "messages are sent, and startConfiguration was not called: the daemon drops them");
-  if (unacknowledged_.empty() || unacknowledged_.back().serial != serial_ - 1)
+  if (unacknowledged_.empty() || unacknowledged_.back().serial != *serial - 1)
     unacknowledged_.push_back({0, 0});
-  unacknowledged_.back().serial = serial_;
+  unacknowledged_.back().serial = *serial;
   ++unacknowledged_.back().count;
 }
 
@@ -180,8 +179,8 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
   if (!command->given) return;
   Call& call = command->call;
   if (call.method == Method::finishSessionGracefully) ending_ = true;
-  const uint32_t serial = ++serial_;
-  if (!encodeCall(call, serial)) {
+  const std::optional<uint32_t> serial = output_.call(call, handshake_.descriptorsAgreed());
+  if (!serial) {
     figures_.droppedInvalid.add();
     call.answer.fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
     return;
@@ -189,42 +188,22 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
   kept_.takeOver(call);
   if (call.method == Method::startConfigWithCompletionHandler && standing_.state() == State::connected)
     standing_.note(State::connected, reasonOfConnected(true));
-  pending_.push_back({serial, std::move(command)});
+  pending_.push_back({*serial, std::move(command)});
 }
 
 bool Session::write(SteadyTime now) {
-  bool any = false;
-  while (wantsToWrite()) {
-    std::vector<int> descriptors;  // of the mark, which owns them until they have left
-    size_t end = out_.size();
-    const bool marked = !marks_.empty() && marks_.front().offset == outAt_;
-    if (marked)
-      for (const Descriptor& descriptor : marks_.front().descriptors) descriptors.push_back(descriptor.get());
-    const size_t next = marked ? 1 : 0;
-    if (marks_.size() > next) end = marks_[next].offset;
-    size_t written = 0;
-    const Outcome outcome =
-        socket_.write(std::string_view(out_).substr(outAt_, end - outAt_), descriptors, written);
-    if (outcome == Outcome::wouldBlock) return any;
-    if (outcome == Outcome::ended) {
-      readable(now);  // what the daemon said before it ended the connection
-      if (!done_ && socket_.isOpen()) disconnected(now, "the connection ended");
-      return any;
-    }
-    if (marked) marks_.pop_front();
-    outAt_ += written;
-    any = true;
+  const Output::Written written = output_.writeTo(socket_);
+  if (written.ended) {
+    readable(now);  // what the daemon said before it ended the connection
+    if (!done_ && socket_.isOpen()) disconnected(now, "the connection ended");
   }
-  out_.clear();
-  outAt_ = 0;
-  return any;
+  return written.any;
 }
 
 void Session::pingIfDue(SteadyTime now) {
   if (unacknowledged_.empty() || ping_ || now - lastPing_ < kPingInterval) return;
-  const uint32_t serial = ++serial_;
-  if (!encodePing(serial)) return;
-  ping_ = serial;
+  ping_ = output_.ping();
+  if (!ping_) return;
   lastPing_ = now;
 }
 
@@ -273,12 +252,12 @@ void Session::tellAgain() {
 }
 
 bool Session::sendAgain(Call call) {
-  const uint32_t serial = ++serial_;
-  if (!encodeCall(call, serial)) return false;
+  const std::optional<uint32_t> serial = output_.call(call, handshake_.descriptorsAgreed());
+  if (!serial) return false;
   if (call.method == Method::setSessionInfo) return true;  // one way
   auto command = std::make_unique<Command>(std::move(call));
   command->replayed = true;
-  pending_.push_back({serial, std::move(command)});
+  pending_.push_back({*serial, std::move(command)});
   return true;
 }
 
@@ -330,6 +309,52 @@ void Session::handleReply(const Message& message) {
   const bool last = command->call.method == Method::finishSessionGracefully || single_;
   complete(*command, message);
   if (last) end(ClientError::closed, "the session was closed");
+}
+
+void Session::complete(Command& command, const Message& message) {
+  const Method method = command.call.method;
+  if (message.type == wire::MessageType::error) {
+    const std::string text = daemonError(message).localizedDescription;
+    standing_.say(std::string(wire::contractOf(method).member) + ": " + text);
+    if (command.replayed) figures_.replayFailed.add();
+    command.call.answer.fail(ClientError::refused, text);
+    return;
+  }
+  std::optional<Reply> reply = readReply(method, message);
+  if (!reply)
+    return command.call.answer.fail(ClientError::refused,
+                                    "the daemon's answer has another form than this library knows");
+  if (const auto* names = std::get_if<StateNames>(&reply->result)) learnStates(*names);
+  command.call.answer.give(std::move(*reply));
+}
+
+void Session::learnStates(const StateNames& names) {
+  if (!kept_.isConfigured()) return;
+  if (!names) return standing_.become(State::noStorebag, kept_.whyNoStorebag());
+  if (names->empty()) return standing_.become(State::noLiveBackEnd, kept_.whyNotLive());
+  std::string live;
+  for (const std::string& name : *names) live += (live.empty() ? "" : " ") + name;
+  standing_.become(State::live, std::move(live));
+}
+
+void Session::handleCall(const Message& message) {
+  const bool ours = message.path == wire::kClientPath && message.member == wire::kSendMessageToClient &&
+                    (message.interface.empty() || message.interface == wire::kReplyInterface);
+  AggregatedMessage aggregated;
+  BodyReader reader(message);
+  if (ours && reader.hasSignature(wire::kSendMessageToClientSignature) &&
+      reader.readOptionalDictionary(aggregated.sessionInfo) && reader.readDouble(aggregated.timestamp) &&
+      reader.readUInt16(aggregated.category) && reader.readUInt16(aggregated.type) &&
+      reader.readOptionalDictionary(aggregated.payload) && reader.finish() == BodyStatus::ok) {
+    if (aggregationBlock_) {
+      // Kept aside while it runs: the program may close the session from inside.
+      auto block = std::move(aggregationBlock_);
+      block(aggregated);
+      if (!done_) aggregationBlock_ = std::move(block);
+    }
+    return;
+  }
+  if (message.expectsReply()) output_.refuse(message.serial);
 }
 
 }  // namespace kyt::client
