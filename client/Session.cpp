@@ -42,7 +42,7 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
       standing_(nameOf(options.sessionInfo, single), std::move(options.onStateChange)),
       kept_({std::move(options.sessionInfo), std::move(options.userInfo),
              std::move(options.frameworksToCheck), static_cast<bool>(options.aggregationBlock)}),
-      aggregationBlock_(std::move(options.aggregationBlock)) {
+      aggregation_(std::move(options.aggregationBlock)) {
   if (problem_.empty()) return;
   closed_ = true;
   standing_.become(KYTReporting::State::refused, problem_);
@@ -111,19 +111,13 @@ std::string Session::stateReason() const {
 bool Session::finishAndWait(milliseconds timeout) {
   if (refuses()) return false;
   KYTReporting::SuccessCompletion said = [this](bool success, const std::optional<Error>&) {
-    MutexLock lock(stateMutex_);
-    finished_ = finished_ || success;  // a second goodbye that fails takes nothing back
-    goodbyeOver_ = true;
-    stateChanged_.notifyAll();
+    waiters_.goodbyeAnswered(success);
   };
   enqueueCommand(std::make_unique<Command>(Call{Method::finishSessionGracefully, {}, std::move(said)}));
   saidGoodbye_ = true;
   if (loop_->isCurrentThread()) return false;
   loop_->wake();  // without a daemon it gives up at once
-  const MonotonicTime end = std::chrono::steady_clock::now() + std::min(timeout, kLongestWait);
-  MutexLock lock(stateMutex_);
-  while (!goodbyeOver_ && stateChanged_.waitUntil(stateMutex_, end)) continue;
-  return finished_;
+  return waiters_.waitForGoodbye(std::min(timeout, kLongestWait));
 }
 
 void Session::close() {
@@ -134,8 +128,7 @@ void Session::close() {
       return;
     }
     loop_->wake();
-    MutexLock lock(stateMutex_);
-    while (!ended_) stateChanged_.wait(stateMutex_);
+    waiters_.waitForEnd();
   }
   standing_.sayDrops(statistics());
 }
@@ -177,11 +170,8 @@ void Session::end(ClientError code, const std::string& reason) {
   standing_.announce();
   standing_.dropBlock();
   failAll(std::move(answers), code, reason);
-  aggregationBlock_ = nullptr;
-  MutexLock lock(stateMutex_);
-  goodbyeOver_ = true;
-  ended_ = true;
-  stateChanged_.notifyAll();
+  aggregation_.end();
+  waiters_.sessionEnded();
 }
 
 // A completion may close the session: then the others have run before close() returns, and not with what the program

@@ -12,14 +12,14 @@
 #include <optional>
 #include <string>
 
+#include "client/Aggregation.h"
 #include "client/Command.h"
 #include "client/Figures.h"
 #include "client/KeptState.h"
 #include "client/OutgoingQueue.h"
 #include "client/Output.h"
 #include "client/Standing.h"
-#include "platform/base/ConditionVariable.h"
-#include "platform/base/Mutex.h"
+#include "client/Waiters.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/linux/client/ClientSocket.h"
 
@@ -97,7 +97,6 @@ class Session {
   [[nodiscard]] const char* readMessages(size_t& at);
   void handle(const Message& message);
   void handleReply(const Message& message);
-  void handleCall(const Message& message);
   void acknowledge(uint32_t serial);
   void complete(Command& command, const Message& message);
   void learnStates(const StateNames& names);
@@ -120,15 +119,11 @@ class Session {
   std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
   std::atomic<bool> unserved_{false};  // there was no thread for it
   Standing standing_;
-  Mutex stateMutex_;
-  ConditionVariable stateChanged_;
-  bool finished_ GUARDED_BY(stateMutex_) = false;     // the goodbye was answered
-  bool goodbyeOver_ GUARDED_BY(stateMutex_) = false;  // answered or failed
-  bool ended_ GUARDED_BY(stateMutex_) = false;        // nothing runs any more
+  Waiters waiters_;
 
   // The library's thread.
   KeptState kept_;
-  Function<void(const AggregatedMessage&)> aggregationBlock_;
+  Aggregation aggregation_;
   linux_client::ClientSocket socket_;
   ClientHandshake handshake_;
   bool handshakeDone_ = false, ending_ = false, done_ = false;

@@ -4,7 +4,6 @@
 
 #include "client/Replay.h"
 #include "client/Session.h"
-#include "platform/ipc/BodyReader.h"
 #include "platform/ipc/MessageReader.h"
 
 namespace kyt::client {
@@ -281,7 +280,7 @@ void Session::handle(const Message& message) {
       handleReply(message);
       return;
     case wire::MessageType::methodCall:
-      handleCall(message);
+      if (!aggregation_.handle(message) && message.expectsReply()) output_.refuse(message.serial);
       return;
     case wire::MessageType::signal:
       return;
@@ -335,26 +334,6 @@ void Session::learnStates(const StateNames& names) {
   std::string live;
   for (const std::string& name : *names) live += (live.empty() ? "" : " ") + name;
   standing_.become(State::live, std::move(live));
-}
-
-void Session::handleCall(const Message& message) {
-  const bool ours = message.path == wire::kClientPath && message.member == wire::kSendMessageToClient &&
-                    (message.interface.empty() || message.interface == wire::kReplyInterface);
-  AggregatedMessage aggregated;
-  BodyReader reader(message);
-  if (ours && reader.hasSignature(wire::kSendMessageToClientSignature) &&
-      reader.readOptionalDictionary(aggregated.sessionInfo) && reader.readDouble(aggregated.timestamp) &&
-      reader.readUInt16(aggregated.category) && reader.readUInt16(aggregated.type) &&
-      reader.readOptionalDictionary(aggregated.payload) && reader.finish() == BodyStatus::ok) {
-    if (aggregationBlock_) {
-      // Kept aside while it runs: the program may close the session from inside.
-      auto block = std::move(aggregationBlock_);
-      block(aggregated);
-      if (!done_) aggregationBlock_ = std::move(block);
-    }
-    return;
-  }
-  if (message.expectsReply()) output_.refuse(message.serial);
 }
 
 }  // namespace kyt::client

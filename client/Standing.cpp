@@ -40,18 +40,14 @@ void Standing::become(State state, std::string why) {
   if (told == told_) return;
   told_ = std::move(told);
   say(told_);
-  if (block_) changes_.emplace_back(state, std::move(why));
+  if (block_.isReady()) changes_.emplace_back(state, std::move(why));
 }
 
 void Standing::announce() {
-  while (block_ && !changes_.empty()) {
+  while (block_.isReady() && !changes_.empty()) {
     const auto [state, why] = std::move(changes_.front());
     changes_.pop_front();
-    // Kept aside while it runs: the program may close the session from inside.
-    Block block = std::move(block_);
-    block_ = nullptr;
-    block(state, why);
-    if (!over_) block_ = std::move(block);
+    block_.run(state, why);
   }
 }
 

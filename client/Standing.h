@@ -10,6 +10,7 @@
 #include <string>
 #include <utility>
 
+#include "client/ProgramBlock.h"
 #include "kytreporting/KYTReporting.h"
 #include "platform/base/Mutex.h"
 
@@ -33,10 +34,7 @@ class Standing {
   void note(State state, std::string why);
   // Runs the block for what became. It may close the session.
   void announce();
-  void dropBlock() {
-    over_ = true;
-    block_ = nullptr;
-  }
+  void dropBlock() { block_.drop(); }
 
   // Lines on standard error, if they are wanted; say() on any thread.
   void say(const std::string& text) const;
@@ -48,8 +46,7 @@ class Standing {
   std::atomic<State> state_{State::noDaemon};
   mutable Mutex mutex_;
   std::string why_ GUARDED_BY(mutex_);
-  Block block_;
-  bool over_ = false;  // the block is told nothing more
+  ProgramBlock<State, const std::string&> block_;
   std::deque<std::pair<State, std::string>> changes_;
   std::string told_;  // the last reason that was worth telling, with its state
   KYTReporting::Statistics said_;
