@@ -33,7 +33,6 @@ std::string secondsText(milliseconds time) {
 
 Session::Session(KYTReporting::Options options, Loop* loop, bool single)
     : problem_(problemOf(options.sessionInfo)),
-      path_(std::move(options.socketPath)),
       single_(single),
       callDeadline_(std::min(options.callDeadline, kLongestWait)),
       finishWaitsForDaemon_(options.finishWaitsForDaemon),
@@ -42,7 +41,8 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
       standing_(nameOf(options.sessionInfo, single), std::move(options.onStateChange)),
       kept_({std::move(options.sessionInfo), std::move(options.userInfo),
              std::move(options.frameworksToCheck), static_cast<bool>(options.aggregationBlock)}),
-      aggregation_(std::move(options.aggregationBlock)) {
+      aggregation_(std::move(options.aggregationBlock)),
+      connection_(std::move(options.socketPath)) {
   if (problem_.empty()) return;
   closed_ = true;
   standing_.become(KYTReporting::State::refused, problem_);
@@ -50,7 +50,7 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
 
 Session::~Session() {
   // Commands that were queued while the session ended.
-  Item item;
+  OutgoingQueue::Item item;
   while (queue_.pop(item))
     if (item.command) item.command->call.answer.fail(ClientError::closed, "the session is closed");
 }
@@ -70,7 +70,8 @@ bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payl
     figures_.droppedQueueFull.add();
     return false;
   }
-  noticeWork();
+  // Without a connection the thread looks at the queue by itself as soon as it has one.
+  if (connected_.load(std::memory_order_seq_cst)) loop_->noticeWork();
   return true;
 }
 
@@ -92,11 +93,6 @@ Error Session::refusal() const {
   if (!problem_.empty()) return clientError(ClientError::invalid, problem_);
   if (unserved_) return clientError(ClientError::notConnected, standing_.why());
   return clientError(ClientError::closed, "the session is closed");
-}
-
-void Session::noticeWork() {
-  // Without a connection the thread looks at the queue by itself as soon as it has one.
-  if (connected_.load(std::memory_order_seq_cst)) loop_->noticeWork();
 }
 
 KYTReporting::Statistics Session::statistics() const {
@@ -135,7 +131,7 @@ void Session::close() {
 
 void Session::becomeInert() {
   inert_ = true;
-  socket_.close();
+  connection_.close();
 }
 
 void Session::endUnserved() {
@@ -150,26 +146,21 @@ void Session::end(ClientError code, const std::string& reason) {
   done_ = true;
   closed_ = true;
   connected_ = false;
-  socket_.close();
+  connection_.close();
   // All is counted before anyone is told of the end.
-  uint64_t lost = 0;
-  for (const Unacknowledged& entry : unacknowledged_) lost += entry.count;
-  unacknowledged_.clear();
-  std::vector<Answer> answers;
-  for (Pending& entry : pending_) answers.push_back(std::move(entry.command->call.answer));
-  pending_.clear();
-  Item item;
+  Unanswered::Left left = unanswered_.takeAll();
+  OutgoingQueue::Item item;
   while (queue_.pop(item)) {
     if (item.command)
-      answers.push_back(std::move(item.command->call.answer));
+      left.answers.push_back(std::move(item.command->call.answer));
     else
-      ++lost;
+      ++left.messages;
   }
-  figures_.lostOnConnectionEnd.add(lost);
+  figures_.lostOnConnectionEnd.add(left.messages);
   standing_.sayDrops(statistics());
   standing_.announce();
   standing_.dropBlock();
-  failAll(std::move(answers), code, reason);
+  failAll(std::move(left.answers), code, reason);
   aggregation_.end();
   waiters_.sessionEnded();
 }
@@ -187,7 +178,7 @@ void Session::failAll(std::vector<Answer> answers, ClientError code, const std::
 
 // Completions that waited too long for a daemon get an error.
 void Session::expire(SteadyTime now) {
-  if (handshakeDone_) return queue_.suspendDeadlines();
+  if (connection_.isTaken()) return queue_.suspendDeadlines();
   std::vector<Answer> late = queue_.takeExpired(now);
   if (late.empty()) return;
   figures_.waitedTooLong.add(late.size());

@@ -14,14 +14,14 @@
 
 #include "client/Aggregation.h"
 #include "client/Command.h"
+#include "client/Connection.h"
 #include "client/Figures.h"
 #include "client/KeptState.h"
 #include "client/OutgoingQueue.h"
 #include "client/Output.h"
 #include "client/Standing.h"
+#include "client/Unanswered.h"
 #include "client/Waiters.h"
-#include "platform/ipc/Handshake.h"
-#include "platform/linux/client/ClientSocket.h"
 
 namespace kyt {
 struct Message;
@@ -62,17 +62,17 @@ class Session {
   void readable(SteadyTime now);
   [[nodiscard]] bool hasWork() const;
   [[nodiscard]] bool isDone() const { return done_; }
-  [[nodiscard]] int fd() const { return socket_.fd(); }
+  [[nodiscard]] int fd() const { return connection_.fd(); }
   [[nodiscard]] bool wantsToWrite() const { return output_.waiting() > 0; }
   // When pump() has something to do without being told, or none.
   [[nodiscard]] std::optional<SteadyTime> nextDeadline() const;
   void end(ClientError code, const std::string& reason);  // every completion runs
 
  private:
-  using Item = OutgoingQueue::Item;
-  struct Pending {
-    uint32_t serial = 0;
-    std::unique_ptr<Command> command;
+  struct Failing {
+    Answer answer;
+    ClientError code;
+    std::string reason;
   };
 
   [[nodiscard]] bool refuses() const {
@@ -80,7 +80,6 @@ class Session {
            saidGoodbye_.load(std::memory_order_relaxed);
   }
   [[nodiscard]] Error refusal() const;
-  void noticeWork();
   [[nodiscard]] bool ensureConnected(SteadyTime now);
   void connect(SteadyTime now);
   bool move(SteadyTime now);
@@ -93,11 +92,10 @@ class Session {
   void drainCommand(std::unique_ptr<Command> command);
   bool write(SteadyTime now);
   void pingIfDue(SteadyTime now);
-  [[nodiscard]] const char* readHandshake(size_t& at);
-  [[nodiscard]] const char* readMessages(size_t& at);
+  void greet();
+  [[nodiscard]] const char* readMessages();
   void handle(const Message& message);
   void handleReply(const Message& message);
-  void acknowledge(uint32_t serial);
   void complete(Command& command, const Message& message);
   void learnStates(const StateNames& names);
 
@@ -107,7 +105,6 @@ class Session {
 
   // Constant.
   const std::string problem_;  // of the session's information: nothing is sent
-  const std::string path_;
   const bool single_;
   const std::chrono::milliseconds callDeadline_;
   const bool finishWaitsForDaemon_;
@@ -124,31 +121,13 @@ class Session {
   // The library's thread.
   KeptState kept_;
   Aggregation aggregation_;
-  linux_client::ClientSocket socket_;
-  ClientHandshake handshake_;
-  bool handshakeDone_ = false, ending_ = false, done_ = false;
-  bool everTaken_ = false;         // a daemon once completed a handshake
-  bool nobodyThere_ = false;       // the last attempt found no daemon, or one that refuses
-  bool daemonEnds_ = false;        // it said so in the handshake
-  bool triedAtGoodbye_ = false;    // the last attempt before giving up
-  unsigned endedInHandshake_ = 0;  // connections in a row
-  std::string in_;
+  Connection connection_;
   Output output_;
-  std::deque<Pending> pending_;
-  struct Failing {
-    Answer answer;
-    ClientError code;
-    std::string reason;
-  };
+  Unanswered unanswered_;
   std::deque<Failing> failing_;  // whose completions run now
-  struct Unacknowledged {
-    uint32_t serial;
-    uint32_t count;
-  };
-  std::deque<Unacknowledged> unacknowledged_;  // messages by the serial up to which they go
-  std::optional<uint32_t> ping_;               // the serial of one that is not answered
-  SteadyTime lastPing_{}, nextAttempt_{};
-  std::chrono::milliseconds backoff_{0};
+  bool ending_ = false;          // the goodbye is said: nothing goes after it
+  bool triedAtGoodbye_ = false;  // the last attempt before giving up
+  bool done_ = false;
 };
 
 }  // namespace kyt::client
