@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <mutex>
+#include <utility>
 
 namespace kyt::client {
 
@@ -72,14 +73,26 @@ void Loop::noticeWork() {
   if (sleeping_.load(std::memory_order_relaxed) && sleeping_.exchange(false)) wakeUp_.wake();
 }
 
-bool Loop::turn(std::vector<std::shared_ptr<Session>>& sessions) {
+bool Loop::turn(const Sessions& sessions) {
   bool active = false;
   const SteadyTime now = Steady::now();
   for (const auto& session : sessions) active |= session->pump(now);
   return active;
 }
 
-milliseconds Loop::timeout(const std::vector<std::shared_ptr<Session>>& sessions, bool active) const {
+bool Loop::anyHasWork(const Sessions& sessions) {
+  for (const auto& session : sessions)
+    if (session->hasWork()) return true;
+  return false;
+}
+
+bool Loop::anyIsDone(const Sessions& sessions) {
+  for (const auto& session : sessions)
+    if (session->isDone()) return true;
+  return false;
+}
+
+milliseconds Loop::timeout(const Sessions& sessions, bool active) const {
   if (active) return kLookInterval;
   milliseconds timeout{-1};
   const SteadyTime now = Steady::now();
@@ -93,47 +106,52 @@ milliseconds Loop::timeout(const std::vector<std::shared_ptr<Session>>& sessions
   return timeout;
 }
 
+// Those that go on; with none of them the thread is to end.
+Loop::Sessions Loop::sessionsLeft() {
+  MutexLock lock(mutex_);
+  std::erase_if(sessions_, [](const auto& session) {
+    libraryThread.assertCurrent();
+    return session->isDone();
+  });
+  if (sessions_.empty()) running_ = false;
+  return sessions_;
+}
+
+void Loop::wait(const Sessions& sessions, bool active, linux_client::WaitSet& waits) {
+  waits.clear();
+  const size_t wakeIndex = waits.add(wakeUp_.fd(), false);
+  std::vector<std::pair<size_t, Session*>> indexes;
+  for (const auto& session : sessions)
+    if (session->fd() >= 0)
+      indexes.emplace_back(waits.add(session->fd(), session->wantsToWrite()), session.get());
+  waits.wait(timeout(sessions, active));
+  sleeping_.store(false);
+  if (waits.ready(wakeIndex)) wakeUp_.clear();
+  const SteadyTime now = Steady::now();
+  for (const auto& [index, session] : indexes)
+    if (waits.ready(index) && session->fd() >= 0) session->readable(now);
+}
+
 void Loop::run() {
   threadLoop = this;
-  std::vector<std::shared_ptr<Session>> sessions;
+  libraryThread.assertCurrent();
+  Sessions sessions;
   linux_client::WaitSet waits;
   SteadyTime lastActive = Steady::now();
   for (;;) {
-    std::vector<std::shared_ptr<Session>> former;  // those that end here run completions: without the lock
-    former.swap(sessions);
     {
-      MutexLock lock(mutex_);
-      std::erase_if(sessions_, [](const auto& session) { return session->isDone(); });
-      sessions = sessions_;
-      if (sessions.empty()) {
-        running_ = false;
-        return;
-      }
+      // Those that end here run completions: without the lock, and before the thread waits.
+      const Sessions former = std::exchange(sessions, sessionsLeft());
     }
-    former.clear();
+    if (sessions.empty()) return;
     if (turn(sessions)) lastActive = Steady::now();
     bool active = Steady::now() - lastActive < kQuietAfter;
     if (!active) {
       sleeping_.store(true);
       std::atomic_thread_fence(std::memory_order_seq_cst);
-      // What was queued before anyone could see that this thread sleeps.
-      active = std::any_of(sessions.begin(), sessions.end(),
-                           [](const auto& session) { return session->hasWork(); });
+      active = anyHasWork(sessions);  // what was queued before anyone could see that this thread sleeps
     }
-    if (std::any_of(sessions.begin(), sessions.end(), [](const auto& session) { return session->isDone(); }))
-      continue;
-    waits.clear();
-    const size_t wakeIndex = waits.add(wakeUp_.fd(), false);
-    std::vector<std::pair<size_t, Session*>> indexes;
-    for (const auto& session : sessions)
-      if (session->fd() >= 0)
-        indexes.emplace_back(waits.add(session->fd(), session->wantsToWrite()), session.get());
-    waits.wait(timeout(sessions, active));
-    sleeping_.store(false);
-    if (waits.ready(wakeIndex)) wakeUp_.clear();
-    const SteadyTime now = Steady::now();
-    for (const auto& [index, session] : indexes)
-      if (waits.ready(index) && session->fd() >= 0) session->readable(now);
+    if (!anyIsDone(sessions)) wait(sessions, active, waits);
   }
 }
 

@@ -34,15 +34,20 @@ class Loop {
  private:
   Loop() = default;
   void run();
-  bool turn(std::vector<std::shared_ptr<Session>>& sessions);
-  [[nodiscard]] std::chrono::milliseconds timeout(const std::vector<std::shared_ptr<Session>>& sessions,
-                                                  bool active) const;
+  using Sessions = std::vector<std::shared_ptr<Session>>;
+  [[nodiscard]] Sessions sessionsLeft() REQUIRES(libraryThread);
+  static bool turn(const Sessions& sessions) REQUIRES(libraryThread);
+  [[nodiscard]] static bool anyHasWork(const Sessions& sessions) REQUIRES(libraryThread);
+  [[nodiscard]] static bool anyIsDone(const Sessions& sessions) REQUIRES(libraryThread);
+  void wait(const Sessions& sessions, bool active, linux_client::WaitSet& waits) REQUIRES(libraryThread);
+  [[nodiscard]] std::chrono::milliseconds timeout(const Sessions& sessions, bool active) const
+      REQUIRES(libraryThread);
   static void installForkHandlers();
 
   linux_client::WakeUp wakeUp_;
   std::atomic<bool> sleeping_{false};
   Mutex mutex_;
-  std::vector<std::shared_ptr<Session>> sessions_ GUARDED_BY(mutex_);
+  Sessions sessions_ GUARDED_BY(mutex_);
   bool running_ GUARDED_BY(mutex_) = false;
 };
 

@@ -62,6 +62,7 @@ std::vector<Answer> OutgoingQueue::takeExpired(SteadyTime now) {
   if (!commandQueued_.exchange(false) && now < nextDeadline_) return late;
   nextDeadline_ = SteadyTime::max();
   const auto look = [&](const std::unique_ptr<Command>& command) {
+    libraryThread.assertCurrent();
     if (!command || !command->deadline) return;
     if (*command->deadline > now) {
       nextDeadline_ = std::min(nextDeadline_, *command->deadline);

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "client/Command.h"
+#include "client/LibraryThread.h"
 #include "client/MessageRing.h"
 #include "platform/base/Mutex.h"
 
@@ -42,19 +43,21 @@ class OutgoingQueue {
   [[nodiscard]] size_t size() const { return ring_.size() + overflowed_.load(std::memory_order_relaxed); }
 
   // The next in order; false: there is none.
-  bool pop(Item& item);
-  [[nodiscard]] bool isEmpty() const { return ring_.empty() && overflowed_.load() == 0; }
+  bool pop(Item& item) REQUIRES(libraryThread);
+  [[nodiscard]] bool isEmpty() const REQUIRES(libraryThread) {
+    return ring_.empty() && overflowed_.load() == 0;
+  }
 
   // The completions whose deadline has passed while no daemon was there; their commands stay where they stand. Costs
   // nothing until a deadline is near or a call was queued.
-  [[nodiscard]] std::vector<Answer> takeExpired(SteadyTime now);
+  [[nodiscard]] std::vector<Answer> takeExpired(SteadyTime now) REQUIRES(libraryThread);
   // A daemon is there: no deadline counts until lookAgain().
-  void suspendDeadlines() { commandQueued_.store(false); }
-  void lookAgain() { commandQueued_.store(true); }
+  void suspendDeadlines() REQUIRES(libraryThread) { commandQueued_.store(false); }
+  void lookAgain() REQUIRES(libraryThread) { commandQueued_.store(true); }
   // Whether takeExpired() has to look at calls that it has not seen yet.
   [[nodiscard]] bool hasNewCommand() const { return commandQueued_.load(); }
   // The nearest deadline as the last takeExpired() saw it, or max().
-  [[nodiscard]] SteadyTime nextDeadline() const { return nextDeadline_; }
+  [[nodiscard]] SteadyTime nextDeadline() const REQUIRES(libraryThread) { return nextDeadline_; }
 
  private:
   const size_t maxBytes_;
@@ -68,7 +71,7 @@ class OutgoingQueue {
   std::deque<std::unique_ptr<Command>> overflow_ GUARDED_BY(mutex_);  // of commands that found the ring full
 
   // The library's thread.
-  SteadyTime nextDeadline_ = SteadyTime::max();
+  SteadyTime nextDeadline_ GUARDED_BY(libraryThread) = SteadyTime::max();
 };
 
 }  // namespace kyt::client

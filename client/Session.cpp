@@ -120,21 +120,25 @@ void Session::close() {
   if (!inert_) {
     closed_ = true;
     if (loop_->isCurrentThread()) {
+      libraryThread.assertCurrent();
       end(ClientError::closed, "the session was closed");
       return;
     }
     loop_->wake();
     waiters_.waitForEnd();
   }
+  libraryThread.assertCurrent();  // nothing runs there for this session
   standing_.sayDrops(statistics());
 }
 
 void Session::becomeInert() {
+  libraryThread.assertCurrent();  // the parent has it
   inert_ = true;
   connection_.close();
 }
 
 void Session::endUnserved() {
+  libraryThread.assertCurrent();  // there is none
   const std::string reason = problem_.empty() ? "the system gives the library no thread" : problem_;
   if (problem_.empty()) standing_.become(KYTReporting::State::noDaemon, reason);
   unserved_ = true;

@@ -17,6 +17,7 @@
 #include "client/Connection.h"
 #include "client/Figures.h"
 #include "client/KeptState.h"
+#include "client/LibraryThread.h"
 #include "client/OutgoingQueue.h"
 #include "client/Output.h"
 #include "client/Standing.h"
@@ -58,15 +59,15 @@ class Session {
 
   // The library's thread: moves everything that can be moved now; whether anything was. False from isDone()
   // on.
-  bool pump(SteadyTime now);
-  void readable(SteadyTime now);
-  [[nodiscard]] bool hasWork() const;
-  [[nodiscard]] bool isDone() const { return done_; }
-  [[nodiscard]] int fd() const { return connection_.fd(); }
-  [[nodiscard]] bool wantsToWrite() const { return output_.waiting() > 0; }
+  bool pump(SteadyTime now) REQUIRES(libraryThread);
+  void readable(SteadyTime now) REQUIRES(libraryThread);
+  [[nodiscard]] bool hasWork() const REQUIRES(libraryThread);
+  [[nodiscard]] bool isDone() const REQUIRES(libraryThread) { return done_; }
+  [[nodiscard]] int fd() const REQUIRES(libraryThread) { return connection_.fd(); }
+  [[nodiscard]] bool wantsToWrite() const REQUIRES(libraryThread) { return output_.waiting() > 0; }
   // When pump() has something to do without being told, or none.
-  [[nodiscard]] std::optional<SteadyTime> nextDeadline() const;
-  void end(ClientError code, const std::string& reason);  // every completion runs
+  [[nodiscard]] std::optional<SteadyTime> nextDeadline() const REQUIRES(libraryThread);
+  void end(ClientError code, const std::string& reason) REQUIRES(libraryThread);  // every completion runs
 
  private:
   struct Failing {
@@ -80,28 +81,29 @@ class Session {
            saidGoodbye_.load(std::memory_order_relaxed);
   }
   [[nodiscard]] Error refusal() const;
-  [[nodiscard]] bool ensureConnected(SteadyTime now);
-  void connect(SteadyTime now);
-  bool move(SteadyTime now);
-  void disconnected(SteadyTime now, std::string reason);
-  [[nodiscard]] bool givesUp() const;
-  void failAll(std::vector<Answer> answers, ClientError code, const std::string& reason);
-  void expire(SteadyTime now);
-  bool drain();
-  void drainMessage(const MessageArguments& message);
-  void drainCommand(std::unique_ptr<Command> command);
-  bool write(SteadyTime now);
-  void pingIfDue(SteadyTime now);
-  void greet();
-  [[nodiscard]] const char* readMessages();
-  void handle(const Message& message);
-  void handleReply(const Message& message);
-  void complete(Command& command, const Message& message);
-  void learnStates(const StateNames& names);
+  [[nodiscard]] bool ensureConnected(SteadyTime now) REQUIRES(libraryThread);
+  void connect(SteadyTime now) REQUIRES(libraryThread);
+  bool move(SteadyTime now) REQUIRES(libraryThread);
+  void disconnected(SteadyTime now, std::string reason) REQUIRES(libraryThread);
+  [[nodiscard]] bool givesUp() const REQUIRES(libraryThread);
+  void failAll(std::vector<Answer> answers, ClientError code, const std::string& reason)
+      REQUIRES(libraryThread);
+  void expire(SteadyTime now) REQUIRES(libraryThread);
+  bool drain() REQUIRES(libraryThread);
+  void drainMessage(const MessageArguments& message) REQUIRES(libraryThread);
+  void drainCommand(std::unique_ptr<Command> command) REQUIRES(libraryThread);
+  bool write(SteadyTime now) REQUIRES(libraryThread);
+  void pingIfDue(SteadyTime now) REQUIRES(libraryThread);
+  void greet() REQUIRES(libraryThread);
+  [[nodiscard]] const char* readMessages() REQUIRES(libraryThread);
+  void handle(const Message& message) REQUIRES(libraryThread);
+  void handleReply(const Message& message) REQUIRES(libraryThread);
+  void complete(Command& command, const Message& message) REQUIRES(libraryThread);
+  void learnStates(const StateNames& names) REQUIRES(libraryThread);
 
   // To a daemon that does not know the session yet.
-  void tellAgain();
-  bool sendAgain(Call call);
+  void tellAgain() REQUIRES(libraryThread);
+  bool sendAgain(Call call) REQUIRES(libraryThread);
 
   // Constant.
   const std::string problem_;  // of the session's information: nothing is sent
@@ -119,15 +121,15 @@ class Session {
   Waiters waiters_;
 
   // The library's thread.
-  KeptState kept_;
-  Aggregation aggregation_;
-  Connection connection_;
-  Output output_;
-  Unanswered unanswered_;
-  std::deque<Failing> failing_;  // whose completions run now
-  bool ending_ = false;          // the goodbye is said: nothing goes after it
-  bool triedAtGoodbye_ = false;  // the last attempt before giving up
-  bool done_ = false;
+  KeptState kept_ GUARDED_BY(libraryThread);
+  Aggregation aggregation_ GUARDED_BY(libraryThread);
+  Connection connection_ GUARDED_BY(libraryThread);
+  Output output_ GUARDED_BY(libraryThread);
+  Unanswered unanswered_ GUARDED_BY(libraryThread);
+  std::deque<Failing> failing_ GUARDED_BY(libraryThread);  // whose completions run now
+  bool ending_ GUARDED_BY(libraryThread) = false;          // the goodbye is said: nothing goes after it
+  bool triedAtGoodbye_ GUARDED_BY(libraryThread) = false;  // the last attempt before giving up
+  bool done_ GUARDED_BY(libraryThread) = false;
 };
 
 }  // namespace kyt::client

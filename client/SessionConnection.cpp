@@ -193,7 +193,10 @@ void Session::greet() {
 }
 
 void Session::tellAgain() {
-  const Replayed told = replay(kept_, [this](Call call) { return sendAgain(std::move(call)); });
+  const Replayed told = replay(kept_, [this](Call call) {
+    libraryThread.assertCurrent();
+    return sendAgain(std::move(call));
+  });
   figures_.replayFailed.add(told.failed);
   if (told.identified) return;
   const std::string reason =

@@ -10,6 +10,7 @@
 #include <string>
 #include <utility>
 
+#include "client/LibraryThread.h"
 #include "client/ProgramBlock.h"
 #include "kytreporting/KYTReporting.h"
 #include "platform/base/Mutex.h"
@@ -29,16 +30,16 @@ class Standing {
   [[nodiscard]] bool debugs() const { return debugs_; }
 
   // Takes over the state and its reason; the block is told by the next announce() when either changed.
-  void become(State state, std::string why);
+  void become(State state, std::string why) REQUIRES(libraryThread);
   // The same for a reason that is not worth telling.
-  void note(State state, std::string why);
+  void note(State state, std::string why) REQUIRES(libraryThread);
   // Runs the block for what became. It may close the session.
-  void announce();
-  void dropBlock() { block_.drop(); }
+  void announce() REQUIRES(libraryThread);
+  void dropBlock() REQUIRES(libraryThread) { block_.drop(); }
 
   // Lines on standard error, if they are wanted; say() on any thread.
   void say(const std::string& text) const;
-  void sayDrops(const KYTReporting::Statistics& figures);
+  void sayDrops(const KYTReporting::Statistics& figures) REQUIRES(libraryThread);
 
  private:
   const std::string name_;
@@ -46,10 +47,10 @@ class Standing {
   std::atomic<State> state_{State::noDaemon};
   mutable Mutex mutex_;
   std::string why_ GUARDED_BY(mutex_);
-  ProgramBlock<State, const std::string&> block_;
-  std::deque<std::pair<State, std::string>> changes_;
-  std::string told_;  // the last reason that was worth telling, with its state
-  KYTReporting::Statistics said_;
+  ProgramBlock<State, const std::string&> block_ GUARDED_BY(libraryThread);
+  std::deque<std::pair<State, std::string>> changes_ GUARDED_BY(libraryThread);
+  std::string told_ GUARDED_BY(libraryThread);  // the last reason that was worth telling, with its state
+  KYTReporting::Statistics said_ GUARDED_BY(libraryThread);
 };
 
 }  // namespace kyt::client

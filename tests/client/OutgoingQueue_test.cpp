@@ -30,7 +30,7 @@ std::unique_ptr<Command> command(Method method, std::string* failure = nullptr) 
 }
 
 // In order: a message's category, a call's name.
-std::vector<std::string> popAll(OutgoingQueue& queue) {
+std::vector<std::string> popAll(OutgoingQueue& queue) REQUIRES(libraryThread) {
   std::vector<std::string> order;
   OutgoingQueue::Item item;
   while (queue.pop(item))
@@ -40,6 +40,7 @@ std::vector<std::string> popAll(OutgoingQueue& queue) {
 }
 
 TEST(OutgoingQueue, KeepsMessagesAndCallsInOrder) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   EXPECT_TRUE(queue.pushMessage(message(1)));
   EXPECT_EQ(queue.pushCommand(command(Method::fetchDisplayURL)), nullptr);
@@ -51,6 +52,7 @@ TEST(OutgoingQueue, KeepsMessagesAndCallsInOrder) {
 }
 
 TEST(OutgoingQueue, RefusesMessagesBeyondItsNumber) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   for (uint16_t i = 0; i < 64; ++i) EXPECT_TRUE(queue.pushMessage(message(i)));
   EXPECT_FALSE(queue.pushMessage(message(64)));
@@ -61,6 +63,7 @@ TEST(OutgoingQueue, RefusesMessagesBeyondItsNumber) {
 }
 
 TEST(OutgoingQueue, RefusesMessagesBeyondItsBytesUntilSomeHaveLeft) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 64 * 1024);
   const std::string half(32 * 1024, 'x');
   EXPECT_TRUE(queue.pushMessage(message(1, half)));
@@ -71,6 +74,7 @@ TEST(OutgoingQueue, RefusesMessagesBeyondItsBytesUntilSomeHaveLeft) {
 }
 
 TEST(OutgoingQueue, TakesCallsThoughItIsFullAndNoMessageBeforeTheyHaveLeft) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   for (uint16_t i = 0; i < 64; ++i) EXPECT_TRUE(queue.pushMessage(message(i)));
   EXPECT_EQ(queue.pushCommand(command(Method::flushMessagesWithCompletion)), nullptr);
@@ -87,6 +91,7 @@ TEST(OutgoingQueue, TakesCallsThoughItIsFullAndNoMessageBeforeTheyHaveLeft) {
 }
 
 TEST(OutgoingQueue, GivesBackACallWhenThereIsNoMoreRoomForCalls) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   std::string failure = "not told";
   std::unique_ptr<Command> refused;
@@ -100,6 +105,7 @@ TEST(OutgoingQueue, GivesBackACallWhenThereIsNoMoreRoomForCalls) {
 }
 
 TEST(OutgoingQueue, TakesTheCompletionsWhoseDeadlineHasPassed) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   std::string flush = "waits", states = "waits", never = "waits";
   auto early = command(Method::flushMessagesWithCompletion, &flush);
@@ -125,6 +131,7 @@ TEST(OutgoingQueue, TakesTheCompletionsWhoseDeadlineHasPassed) {
 }
 
 TEST(OutgoingQueue, KeepsALateCallInItsPlaceAndSaysWhetherItIsStillGiven) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   for (const Method method :
        {Method::flushMessagesWithCompletion, Method::startConfigWithCompletionHandler}) {
@@ -141,6 +148,7 @@ TEST(OutgoingQueue, KeepsALateCallInItsPlaceAndSaysWhetherItIsStillGiven) {
 }
 
 TEST(OutgoingQueue, LooksAtNoDeadlineWhileTheyAreSuspended) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   auto late = command(Method::flushMessagesWithCompletion);
   late->deadline = kNow;
@@ -153,6 +161,7 @@ TEST(OutgoingQueue, LooksAtNoDeadlineWhileTheyAreSuspended) {
 }
 
 TEST(OutgoingQueue, LosesAndReordersNothingOfManyThreads) {
+  libraryThread.assertCurrent();
   OutgoingQueue queue(64, 1 << 20);
   constexpr uint16_t kThreads = 3, kEach = 500;
   std::vector<std::thread> threads;
