@@ -10,6 +10,56 @@ namespace kyt {
 namespace {
 
 constexpr char kByteOrder = std::endian::native == std::endian::little ? 'l' : 'B';
+constexpr size_t kSerialAt = 8;
+
+// A few bytes of a message, put together before they are appended at once: on the road of every event an append for each
+// part of an entry would cost more than the parts do.
+class Piece {
+ public:
+  static constexpr size_t kMaxText = 48;
+
+  // `offset` is where the piece goes, from the beginning of its message.
+  explicit Piece(size_t offset) : offset_(offset) {}
+  void align(size_t alignment) {
+    const size_t padding = (0 - offset_ - size_) & (alignment - 1);
+    std::memset(bytes_ + size_, 0, 8);
+    size_ += padding;
+  }
+  // A signature of one type: its length, its character and a NUL.
+  void signature(char type) {
+    const char bytes[3] = {1, type, 0};
+    put(bytes, sizeof bytes);
+  }
+  template <typename Number>
+  void number(Number value) {
+    align(sizeof value);
+    put(&value, sizeof value);
+  }
+  // Of at most kMaxText bytes.
+  void string(std::string_view text) {
+    number(static_cast<uint32_t>(text.size()));
+    put(text.data(), text.size());
+    bytes_[size_++] = '\0';
+  }
+  [[nodiscard]] std::string_view view() const { return {bytes_, size_}; }
+
+ private:
+  void put(const void* from, size_t size) {
+    std::memcpy(bytes_ + size_, from, size);
+    size_ += size;
+  }
+  const size_t offset_;
+  size_t size_ = 0;
+  char bytes_[2 * kMaxText + 48];
+};
+
+std::span<const DictionaryEntry> entriesOf(const Dictionary& dictionary) {
+  return {dictionary.begin(), dictionary.end()};
+}
+
+bool isShortText(std::string_view text) {
+  return text.size() <= Piece::kMaxText && wire::isPlainText(text);
+}
 
 }  // namespace
 
@@ -85,6 +135,20 @@ void MessageWriter::beginCall(uint32_t serial, const Call& call) {
   fieldText(wire::Field::signature, 'g', call.signature);
   if (call.unixFds != 0) fieldNumber(wire::Field::unixFds, call.unixFds);
   endHeader();
+}
+
+std::string MessageWriter::prepare(const Call& call) {
+  std::string header;
+  MessageWriter(header).beginCall(0, call);
+  return header;
+}
+
+void MessageWriter::beginCall(uint32_t serial, std::string_view prepared) {
+  start_ = out_.size();
+  failed_ = false;
+  out_.append(prepared);
+  std::memcpy(out_.data() + start_ + kSerialAt, &serial, sizeof serial);
+  bodyStart_ = out_.size();
 }
 
 void MessageWriter::beginReply(uint32_t serial, uint32_t replySerial, std::string_view signature,
@@ -177,19 +241,55 @@ void MessageWriter::endArray(const ArrayMark& mark) {
   std::memcpy(out_.data() + mark.lengthAt, &length, 4);
 }
 
-void MessageWriter::writeEntries(const Dictionary& dictionary, int depth) {
+void MessageWriter::writeEntries(std::span<const DictionaryEntry> entries, int depth) {
   if (depth + 2 > Limits::maxIPCDepth) {
     failed_ = true;
     return;
   }
   const ArrayMark mark = beginArray(8);
-  for (const DictionaryEntry& entry : dictionary) {
-    if (entry.value.isNull()) continue;
+  for (const DictionaryEntry& entry : entries) {
+    if (entry.value.isNull() || writeShortEntry(entry, depth + 2)) continue;
     align(8);
     writeString(entry.key);
     writeVariant(entry.value, depth + 2);
   }
   endArray(mark);
+}
+
+// False, and nothing is written: one for the general way.
+bool MessageWriter::writeShortEntry(const DictionaryEntry& entry, int depth) {
+  const std::string_view key = entry.key.view();
+  if (depth + 1 > Limits::maxIPCDepth || !isShortText(key)) return false;
+  Piece piece(out_.size() - start_);
+  piece.align(8);
+  piece.string(key);
+  switch (entry.value.kind()) {
+    case Value::Kind::boolean:
+      piece.signature('b');
+      piece.number(uint32_t{*entry.value.boolean()});
+      break;
+    case Value::Kind::integer:
+      piece.signature('x');
+      piece.number(*entry.value.integer());
+      break;
+    case Value::Kind::unsignedInteger:
+      piece.signature('t');
+      piece.number(*entry.value.unsignedInteger());
+      break;
+    case Value::Kind::real:
+      piece.signature('d');
+      piece.number(*entry.value.real());
+      break;
+    case Value::Kind::string:
+      if (!isShortText(entry.value.string()->view())) return false;
+      piece.signature('s');
+      piece.string(entry.value.string()->view());
+      break;
+    default:
+      return false;
+  }
+  out_.append(piece.view());
+  return true;
 }
 
 void MessageWriter::writeElements(const Array& array, int depth) {
@@ -246,13 +346,17 @@ void MessageWriter::writeVariant(const Value& value, int depth) {
       break;
     case Value::Kind::dictionary:
       out_.append("\5a{sv}\0", 7);
-      writeEntries(*value.dictionary(), depth + 1);
+      writeEntries(entriesOf(*value.dictionary()), depth + 1);
       break;
   }
 }
 
 void MessageWriter::writeDictionary(const Dictionary& dictionary) {
-  writeEntries(dictionary, 0);
+  writeEntries(entriesOf(dictionary), 0);
+}
+
+void MessageWriter::writeDictionary(std::span<const DictionaryEntry> entries) {
+  writeEntries(entries, 0);
 }
 
 void MessageWriter::writeEmptyDictionary() {
@@ -261,7 +365,7 @@ void MessageWriter::writeEmptyDictionary() {
 
 void MessageWriter::writeOptionalDictionary(const std::optional<Dictionary>& value) {
   const ArrayMark mark = beginArray(4);
-  if (value) writeEntries(*value, 1);
+  if (value) writeEntries(entriesOf(*value), 1);
   endArray(mark);
 }
 

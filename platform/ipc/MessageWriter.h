@@ -40,6 +40,9 @@ class MessageWriter {
     uint32_t unixFds = 0;  // how many descriptors travel with the message's first byte
   };
   void beginCall(uint32_t serial, const Call& call);
+  // The header of a call as bytes, for those that differ in nothing but their serials and bodies.
+  [[nodiscard]] static std::string prepare(const Call& call);
+  void beginCall(uint32_t serial, std::string_view prepared);
   void beginReply(uint32_t serial, uint32_t replySerial, std::string_view signature,
                   std::string_view destination = {}, std::string_view sender = {});
   // The body is one string, the error's text; complete, end() included.
@@ -54,6 +57,7 @@ class MessageWriter {
   void writeString(std::string_view text);                               // s
   void writeData(std::span<const std::byte> bytes);                      // ay
   void writeDictionary(const Dictionary& dictionary);                    // a{sv}
+  void writeDictionary(std::span<const DictionaryEntry> entries);        // a{sv}, in that order
   void writeEmptyDictionary();                                           // a{sv}
   void writeOptionalDictionary(const std::optional<Dictionary>& value);  // aa{sv}
   void writeOptionalValue(const Value& value);                           // av; null: none
@@ -81,7 +85,8 @@ class MessageWriter {
   [[nodiscard]] ArrayMark beginArray(size_t elementAlignment);
   void endArray(const ArrayMark& mark);
   void writeVariant(const Value& value, int depth);
-  void writeEntries(const Dictionary& dictionary, int depth);
+  void writeEntries(std::span<const DictionaryEntry> entries, int depth);
+  [[nodiscard]] bool writeShortEntry(const DictionaryEntry& entry, int depth);
   void writeElements(const Array& array, int depth);
 
   std::string& out_;

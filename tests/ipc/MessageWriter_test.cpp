@@ -47,6 +47,86 @@ TEST(MessageWriter, WritesTheHeaderOfACall) {
   EXPECT_EQ(message.unixFds, 3u);
 }
 
+TEST(MessageWriter, BeginsAPreparedCallLikeAnyOther) {
+  const MessageWriter::Call header{.member = "Send", .signature = "a{sv}", .expectsReply = false};
+  const Dictionary dictionary{{"a", 1}};
+  std::string bytes, prepared;
+  for (const uint32_t serial : {7U, 8U}) {
+    MessageWriter writer(bytes);
+    writer.beginCall(serial, header);
+    writer.writeDictionary(dictionary);
+    ASSERT_TRUE(writer.end());
+    MessageWriter other(prepared);
+    other.beginCall(serial, MessageWriter::prepare(header));
+    other.writeDictionary(std::span(dictionary.begin(), dictionary.end()));
+    ASSERT_TRUE(other.end());
+  }
+  EXPECT_EQ(prepared, bytes);
+  MessageWriter writer(prepared, 100);
+  writer.beginCall(9, MessageWriter::prepare(header));
+  writer.writeDictionary(Dictionary{{"a", std::string(200, 'x')}});
+  EXPECT_FALSE(writer.end());
+  EXPECT_EQ(prepared, bytes) << "what does not fit leaves nothing behind";
+}
+
+// Short entries are put together and long ones written part by part: at every offset, and on both sides of the border.
+TEST(MessageWriter, WritesEntriesOfEveryLengthAtEveryOffset) {
+  for (size_t key = 0; key <= 52; ++key)
+    for (const size_t text : {0, 1, 2, 3, 4, 5, 6, 7, 47, 48, 49, 200}) {
+      const std::string name(key, 'k');
+      Dictionary given;
+      given.set(name, std::string(text, 't'));
+      given.set(name + "1", true);
+      given.set(name + "2", -5);
+      given.set(name + "3", 5U);
+      given.set(name + "4", 0.5);
+      given.set(name + "5", Date{1.5});
+      given.set(name + "6", Array{"x", 1});
+      given.set(name + "7", "\xc3\xa4" + name);
+      given.set(name + "8", Data("data"));
+      given.set(name + "9", Dictionary{{name, name}});
+      const std::string bytes = call("a{sv}", [&](MessageWriter& writer) { writer.writeDictionary(given); });
+      Message message;
+      ASSERT_EQ(frame(bytes, message).status, FrameStatus::complete);
+      BodyReader reader(message);
+      Dictionary read;
+      ASSERT_TRUE(reader.hasSignature("a{sv}") && reader.readDictionary(read)) << key << " " << text;
+      ASSERT_EQ(reader.finish(), BodyStatus::ok);
+      ASSERT_EQ(read, given) << key << " " << text;
+    }
+}
+
+TEST(MessageWriter, MendsShortTextThatIsMalformed) {
+  const std::string bytes = call("a{sv}", [](MessageWriter& writer) {
+    writer.writeDictionary(Dictionary{{std::string_view("k\0", 2), "a\xff"}});
+  });
+  Message message;
+  ASSERT_EQ(frame(bytes, message).status, FrameStatus::complete);
+  BodyReader reader(message);
+  Dictionary read;
+  ASSERT_TRUE(reader.hasSignature("a{sv}") && reader.readDictionary(read));
+  EXPECT_EQ(read, (Dictionary{{"k\xef\xbf\xbd", "a\xef\xbf\xbd"}}));
+}
+
+TEST(MessageWriter, RefusesAShortEntryThatIsNestedTooDeeply) {
+  Dictionary deepest{{"a", 1}};
+  size_t depth = 1;
+  for (; depth < 100; ++depth) {
+    std::string bytes;
+    MessageWriter writer(bytes);
+    writer.beginCall(1, {.member = "M", .signature = "a{sv}"});
+    writer.writeDictionary(deepest);
+    if (!writer.end()) break;
+    Message message;
+    ASSERT_EQ(frame(bytes, message).status, FrameStatus::complete);
+    BodyReader reader(message);
+    Dictionary read;
+    ASSERT_TRUE(reader.hasSignature("a{sv}") && reader.readDictionary(read)) << "written, but not to be read";
+    deepest = Dictionary{{"d", deepest}};
+  }
+  EXPECT_LT(depth, 100U);
+}
+
 TEST(MessageWriter, WritesRepliesAndErrors) {
   std::string bytes;
   MessageWriter writer(bytes);
