@@ -1,5 +1,7 @@
 #include "client/Call.h"
 
+#include <span>
+
 #include "platform/ipc/MessageWriter.h"
 #include "platform/objects/Keys.h"
 
@@ -61,13 +63,13 @@ void write(MessageWriter& out, const UploadLogDataArguments& given, uint32_t) {
 }  // namespace
 
 void writeArguments(MessageWriter& out, const MessageArguments& given) {
-  Dictionary message;
-  message.reserve(4);
-  message.append(kKYTReportingMessageParametersCategory, static_cast<unsigned>(given.category));
-  message.append(kKYTReportingMessageParametersType, static_cast<unsigned>(given.type));
-  message.append(kKYTReportingMessageParametersPayload, given.payload);
-  if (given.flag != 0) message.append(kKYTReportingMessageParametersFlag, given.flag);
-  out.writeDictionary(message);
+  // No dictionary, which would take a block from the allocator for each event.
+  const DictionaryEntry entries[] = {
+      {kKYTReportingMessageParametersCategory, static_cast<unsigned>(given.category)},
+      {kKYTReportingMessageParametersType, static_cast<unsigned>(given.type)},
+      {kKYTReportingMessageParametersPayload, given.payload},
+      {kKYTReportingMessageParametersFlag, given.flag != 0 ? Value(given.flag) : Value()}};
+  out.writeDictionary(std::span(entries));
 }
 
 void writeArguments(MessageWriter& out, const Arguments& arguments, uint32_t descriptors) {

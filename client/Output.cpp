@@ -27,11 +27,16 @@ void Output::restart(std::string opening) {
   marks_.clear();
 }
 
+Output::Output()
+    : messageHeader_([] {
+        MessageWriter::Call header = callOf(Method::sendMessageWithDictionary);
+        header.expectsReply = false;
+        return MessageWriter::prepare(header);
+      }()) {}
+
 std::optional<uint32_t> Output::message(const MessageArguments& message) {
   MessageWriter writer(bytes_, kMaxCallBytes);
-  MessageWriter::Call header = callOf(Method::sendMessageWithDictionary);
-  header.expectsReply = false;
-  writer.beginCall(++serial_, header);
+  writer.beginCall(++serial_, messageHeader_);
   writeArguments(writer, message);
   if (!writer.end()) return std::nullopt;
   return serial_;

@@ -19,6 +19,8 @@ namespace kyt::client {
 
 class Output {
  public:
+  Output();
+
   // A new connection: nothing but these bytes. With none: the connection has ended.
   void restart(std::string opening = {});
 
@@ -46,6 +48,7 @@ class Output {
     std::vector<Descriptor> descriptors;
   };
 
+  const std::string messageHeader_;  // of all messages
   std::string bytes_;
   size_t at_ = 0;  // what is before has been written
   std::deque<Mark> marks_;
