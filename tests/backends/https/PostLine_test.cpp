@@ -7,7 +7,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/queues/Semaphore.h"
+#include "platform/base/Semaphore.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TestPlatform.h"
 
