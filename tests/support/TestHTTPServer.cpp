@@ -103,10 +103,15 @@ class Stream {
       : socket_(socket), ssl_(context == nullptr ? nullptr : SSL_new(context)) {
     if (ssl_ != nullptr) SSL_set_fd(ssl_, socket_);
   }
-  ~Stream() { SSL_free(ssl_); }
+  ~Stream() {
+    // A TLS 1.2 session whose connection was not ended in order is never taken up again.
+    if (ssl_ != nullptr) SSL_set_shutdown(ssl_, SSL_SENT_SHUTDOWN);
+    SSL_free(ssl_);
+  }
   Stream(const Stream&) = delete;
   Stream& operator=(const Stream&) = delete;
   bool handshake() { return ssl_ == nullptr || SSL_accept(ssl_) == 1; }
+  bool isResumed() { return ssl_ != nullptr && SSL_session_reused(ssl_) == 1; }
   std::string tlsVersion() { return ssl_ == nullptr ? "" : SSL_get_version(ssl_); }
   bool readMore(std::string& buffer) {
     char bytes[65536];
@@ -238,6 +243,7 @@ class TestHTTPServer::Implementation {
   Handler handler_;
   std::vector<Request> requests_;
   size_t open_ = 0;
+  size_t handshakes_ = 0, resumed_ = 0;
   bool released_ = false;
 
   // A socket stays open until the server stops, so that its number means this connection as long as it is
@@ -272,6 +278,7 @@ class TestHTTPServer::Implementation {
       Stream stream(socket, context_.get());
       std::string buffer;
       if (stream.handshake()) {
+        countHandshake(stream);
         while (std::optional<Request> request = readRequest(stream, buffer)) {
           request->connection = number;
           request->peer = peerOf(socket);
@@ -284,6 +291,13 @@ class TestHTTPServer::Implementation {
     std::lock_guard lock(mutex_);
     --open_;
     changed_.notify_all();
+  }
+
+  void countHandshake(Stream& stream) {
+    if (!context_) return;
+    std::lock_guard lock(mutex_);
+    ++handshakes_;
+    if (stream.isResumed()) ++resumed_;
   }
 
   // Whether the connection goes on.
@@ -393,6 +407,16 @@ bool TestHTTPServer::waitForRequests(size_t count, std::chrono::milliseconds tim
   std::unique_lock lock(implementation_->mutex_);
   return implementation_->changed_.wait_until(lock, std::chrono::steady_clock::now() + timeout,
                                               [&] { return implementation_->requests_.size() >= count; });
+}
+
+size_t TestHTTPServer::handshakes() const {
+  std::lock_guard lock(implementation_->mutex_);
+  return implementation_->handshakes_;
+}
+
+size_t TestHTTPServer::resumedHandshakes() const {
+  std::lock_guard lock(implementation_->mutex_);
+  return implementation_->resumed_;
 }
 
 size_t TestHTTPServer::connectionsAccepted() const {

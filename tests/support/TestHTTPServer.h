@@ -92,6 +92,10 @@ class TestHTTPServer {
   [[nodiscard]] bool waitForConnectionsOpen(size_t count,
                                             std::chrono::milliseconds timeout = kTestDeadline) const;
 
+  // TLS handshakes that were completed, and those of them that took an earlier session up again.
+  [[nodiscard]] size_t handshakes() const;
+  [[nodiscard]] size_t resumedHandshakes() const;
+
   void release();           // lets every held request be answered, now and later
   void loseWhatComes();     // on the connections there are: see LostPackets.h
   void closeConnections();  // cuts all connections; goes on listening

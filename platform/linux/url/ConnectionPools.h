@@ -2,6 +2,7 @@
 // of those whose connections are dead or lead nowhere. Network thread only.
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <memory>
 #include <utility>
@@ -18,35 +19,38 @@ class URLRequests;
 class URLTransfer;
 struct URLSessionState;
 
-// The pools that are idle, longest first; the number of those kept has a limit.
+// The pools that are idle, longest first; the number of connections in them has a limit.
 class IdlePools {
  public:
   explicit IdlePools(size_t most) : most_(most) {}
-  // The pool that had to leave to keep the limit, or null.
-  [[nodiscard]] URLConnectionPool* add(URLConnectionPool& pool) {
+  void add(URLConnectionPool& pool) {
     pools_.append(pool);
-    pool.isKept = true;
-    if (++count_ <= most_) return nullptr;
+    pool.keptConnections = std::max<size_t>(pool.connections(), 1);
+    count_ += pool.keptConnections;
+  }
+  void remove(URLConnectionPool& pool) {
+    if (pool.keptConnections == 0) return;
+    pools_.remove(pool);
+    count_ -= std::exchange(pool.keptConnections, 0);
+  }
+  // The one that has to leave to keep the limit, and has; or null.
+  [[nodiscard]] URLConnectionPool* takeSurplus() {
+    if (count_ <= most_) return nullptr;
     URLConnectionPool* surplus = pools_.first();
     remove(*surplus);
     return surplus;
   }
-  void remove(URLConnectionPool& pool) {
-    if (!std::exchange(pool.isKept, false)) return;
-    pools_.remove(pool);
-    --count_;
-  }
 
  private:
   const size_t most_;
-  size_t count_ = 0;
+  size_t count_ = 0;  // connections
   LinkedList<URLConnectionPool> pools_;
 };
 
 class ConnectionPools {
  public:
   ConnectionPools(URLRequests& requests, NetworkTools& tools, RouteWatch& routes)
-      : requests_(requests), tools_(tools), routes_(routes), idle_(tools.options.maxIdlePools) {}
+      : requests_(requests), tools_(tools), routes_(routes), idle_(tools.options.maxIdleConnections) {}
 
   // The session's connections, or new ones when those would not lead to the server any more.
   [[nodiscard]] URLConnectionPool& poolFor(URLTransfer& transfer);

@@ -1,4 +1,4 @@
-// The functions of libcurl, and the one of libssl that its connections' TLS settings need, loaded by the
+// The functions of libcurl, and those of libssl that its connections' TLS settings need, loaded by the
 // network thread when the first request comes: libcurl brings some thirty other libraries along, which a
 // daemon without sessions must not hold in memory. Network thread only.
 #pragma once
@@ -10,6 +10,7 @@
 #include <variant>
 
 struct ssl_ctx_st;
+struct ssl_st;
 struct x509_store_st;
 
 // The one table of libcurl's functions: what each is called here, and there.
@@ -39,6 +40,10 @@ struct CurlLibrary {
   KYT_CURL_FUNCTIONS(ROW)
 #undef ROW
   void (*setCertificateStore)(ssl_ctx_st*, x509_store_st*) = nullptr;
+  void (*chosenProtocol)(const ssl_st*, const unsigned char** name, unsigned* size) = nullptr;
+
+  // Whether the connection that the handle's request goes on speaks HTTP/2. While it is being sent.
+  [[nodiscard]] bool speaksHTTP2(CURL* handle) const;
 };
 
 }  // namespace kyt

@@ -3,8 +3,9 @@
 // Made and owned by the composition root; see platform/URLSession.h for the contract.
 //
 // Connections verify their server always (TLS 1.2 or newer), negotiate HTTP/2 over TLS, use no proxy, and are
-// kept alive for the session's next request. Completions run on a serial queue of each session, on worker
-// threads of their own ("kyt-url").
+// kept alive for the session's next request. A session has one connection to each server; as long as requests wait too
+// long for those there are, their number doubles, up to eight. Completions run on serial queues, one for each user in each
+// session, on worker threads of their own ("kyt-url").
 //
 // A request is sent once: libcurl would send it again, up to five times, when a kept connection ends under it, and no
 // option forbids that. It goes again only where the server's TCP has acknowledged not a byte of it (URLConnection.h), on
@@ -47,7 +48,10 @@ struct CurlURLSessionOptions {
   Duration requestTime = std::chrono::duration_cast<Duration>(
       std::chrono::duration<double>(Limits::requestSeconds));  // and what its body takes
   Duration idleConnectionTime = std::chrono::seconds(30);      // then a session's connections close
-  size_t maxIdlePools = 512;                                   // sessions with idle connections: descriptors
+  // How long a request waits for a connection in use before another one is made; longer, up to a second, where making one
+  // has taken longer.
+  Duration connectionPatience = std::chrono::milliseconds(100);
+  size_t maxIdleConnections = 1024;  // of all sessions: descriptors
   size_t maxActiveRequests = Limits::maxActiveRequests;
   size_t maxActiveRequestsToOneServer = Limits::maxActiveRequestsToOneServer;
   Duration waitingRetryPeriod = std::chrono::seconds(30);  // the second net under the kernel's events

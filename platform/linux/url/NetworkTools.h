@@ -32,6 +32,7 @@ struct NetworkTools {
   RequestFigures figures;  // self-synchronised
 
   MonotonicTime now;  // when the last wait for events ended
+  Duration rested{};  // how long the thread has waited for events in all
   DeadlineHeap deadlines;
   WatchedSockets sockets;
   RouteTable routes;

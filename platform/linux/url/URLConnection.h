@@ -32,8 +32,10 @@ class URLTransfer;
 class URLConnection {
  public:
   // `interface`: that it is bound to; empty: to none. `peer`: that it is to lead to.
-  URLConnection(int socket, std::string interface, const sockaddr_storage& peer)
-      : socket_(socket), interface_(std::move(interface)), peer_(peer) {}
+  URLConnection(int socket, std::string interface, const sockaddr_storage& peer, MonotonicTime now)
+      : opened(now), socket_(socket), interface_(std::move(interface)), peer_(peer) {}
+
+  const MonotonicTime opened;
 
   [[nodiscard]] int socket() const { return socket_; }
   // Whether it is the one between these addresses; once it was, it stays so until it is closed.
@@ -64,6 +66,7 @@ class URLConnection {
   [[nodiscard]] RouteTable::Way way(RouteTable& routes, bool avoidCellular) const;
 
   bool isSilent = false;                // known to be HTTP/1.1: its server says nothing without being asked
+  bool carriesManyAtOnce = false;       // HTTP/2
   unsigned requests = 0;                // that have begun on it
   std::vector<URLTransfer*> transfers;  // those that have not ended
   std::optional<MonotonicTime> lostSince;  // since when no way leads to the server

@@ -4,6 +4,8 @@
 #include <sys/epoll.h>
 #include <unistd.h>
 
+#include <algorithm>
+
 #include "platform/base/Limits.h"
 #include "platform/linux/url/URLRequests.h"
 #include "platform/linux/url/URLSessionState.h"
@@ -11,8 +13,8 @@
 namespace kyt {
 namespace {
 
-constexpr long kConnectionsPerServer = 8;
-constexpr size_t kKeptHandles = 2;  // each keeps its buffers
+constexpr Duration kMostToConnect = std::chrono::seconds(1);  // then others do not wait for it any more
+constexpr size_t kKeptHandles = 2;                            // each keeps its buffers
 
 CURLcode useCertificates(CURL*, void* context, void* connectionsOf) {
   auto& tools = *static_cast<NetworkTools*>(connectionsOf);
@@ -32,6 +34,9 @@ URLConnectionPool::URLConnectionPool(URLRequests& requests, NetworkTools& tools,
       number_(number),
       curl_(*tools.curl),
       multi_(curl_.multiInit()),
+      growth_(tools,
+              {[this](long most) { curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, most); },
+               [this](URLTransfer& transfer) { lookAgain(transfer); }, [this] { return isConnecting(); }}),
       timer_(
           tools.deadlines, [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); }, this),
       idle_(
@@ -47,8 +52,8 @@ URLConnectionPool::URLConnectionPool(URLRequests& requests, NetworkTools& tools,
   curl_.multiSetOption(multi_, CURLMOPT_SOCKETDATA, this);
   curl_.multiSetOption(multi_, CURLMOPT_TIMERFUNCTION, timerChanged);
   curl_.multiSetOption(multi_, CURLMOPT_TIMERDATA, this);
-  curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, kConnectionsPerServer);
-  curl_.multiSetOption(multi_, CURLMOPT_MAXCONNECTS, kConnectionsPerServer);
+  curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, 1L);
+  curl_.multiSetOption(multi_, CURLMOPT_MAXCONNECTS, ConnectionGrowth::kMost);
 }
 
 URLConnectionPool::~URLConnectionPool() {
@@ -121,6 +126,7 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   }
   transfer.handle = handle;
   ++active_;
+  growth_.wait(transfer);
   leaveIdle();
   return CURLE_OK;
 }
@@ -129,6 +135,7 @@ void URLConnectionPool::remove(URLTransfer& transfer) {
   CURL* handle = std::exchange(transfer.handle, nullptr);
   curl_.multiRemove(multi_, handle);
   transfer.leaveConnection();
+  growth_.leave(transfer);
   transfer.pool = nullptr;
   if (idleHandles_.size() < kKeptHandles) {
     curl_.easySetOption(handle, CURLOPT_ERRORBUFFER, nullptr);
@@ -138,15 +145,45 @@ void URLConnectionPool::remove(URLTransfer& transfer) {
     curl_.easyCleanup(handle);
   }
   --active_;
-  closeIfIdle();
+  closeIfIdle(&transfer);
 }
 
-void URLConnectionPool::closeIfIdle() {
+void URLConnectionPool::hasBegun(URLTransfer& transfer) {
+  growth_.leave(transfer);
+  const std::shared_ptr<URLConnection>& connection = transfer.attempt.connection;
+  if (!connection) return;
+  if (connection->requests == 1) {
+    growth_.connected(tools_.now - connection->opened);
+    connection->carriesManyAtOnce = curl_.speaksHTTP2(transfer.handle);
+  }
+  if (connection->carriesManyAtOnce) growth_.noMatter();
+}
+
+// libcurl puts a request aside that no connection is free for, and does not look at it again before another one ends.
+void URLConnectionPool::lookAgain(URLTransfer& transfer) {
+  curl_.multiRemove(multi_, transfer.handle);
+  if (curl_.multiAdd(multi_, transfer.handle) != CURLM_OK)
+    requests_.fail(transfer, CURLE_FAILED_INIT, curl_.easyErrorText(CURLE_FAILED_INIT));
+}
+
+bool URLConnectionPool::isConnecting() const {
+  return connections_.empty() ||
+         std::any_of(connections_.begin(), connections_.end(), [this](const auto& one) {
+           return !one->isConnected() && tools_.now < one->opened + kMostToConnect;
+         });
+}
+
+void URLConnectionPool::closeIfIdle(const URLTransfer* leaving) {
   if (active_ != 0 || isRetired_) return;
   leaveIdle();
-  const bool now = session_.invalidated.load();
+  growth_.reset();
+  const URLTransfer* first = session_.transfers.first();
+  const bool othersStandInLine = first != nullptr && (first != leaving || first->links.next != nullptr);
+  const bool now = session_.invalidated.load() && !othersStandInLine;
   idle_.set(now ? tools_.now : tools_.now + tools_.options.idleConnectionTime);
-  if (URLConnectionPool* surplus = requests_.pools().idle().add(*this)) surplus->idle_.set(tools_.now);
+  IdlePools& idle = requests_.pools().idle();
+  idle.add(*this);
+  while (URLConnectionPool* surplus = idle.takeSurplus()) surplus->idle_.set(tools_.now);
 }
 
 void URLConnectionPool::leaveIdle() {
@@ -161,7 +198,7 @@ void URLConnectionPool::retire() {
 
 void URLConnectionPool::opened(int socket, std::string interface, const sockaddr_storage& peer) {
   std::erase_if(connections_, [&](const auto& one) { return one->socket() == socket; });
-  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface), peer));
+  connections_.push_back(std::make_shared<URLConnection>(socket, std::move(interface), peer, tools_.now));
 }
 
 std::shared_ptr<URLConnection> URLConnectionPool::connectionBetween(const char* local, int localPort,
@@ -173,8 +210,12 @@ std::shared_ptr<URLConnection> URLConnectionPool::connectionBetween(const char* 
 
 int URLConnectionPool::socketClosed(void* pool, curl_socket_t socket) {
   auto& self = *static_cast<URLConnectionPool*>(pool);
-  for (const auto& one : self.connections_)
-    if (one->socket() == socket) one->closing();
+  for (const auto& one : self.connections_) {
+    if (one->socket() != socket) continue;
+    one->closing();
+    for (URLTransfer* transfer : one->transfers)
+      self.growth_.wait(*transfer);  // those libcurl would send again
+  }
   std::erase_if(self.connections_, [&](const auto& one) { return one->socket() == socket; });
   self.tools_.sockets.closed(socket);
   return close(socket);

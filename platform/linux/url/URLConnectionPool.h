@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/linux/url/ConnectionGrowth.h"
 #include "platform/linux/url/CurlLibrary.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/LinkedList.h"
@@ -47,15 +48,21 @@ class URLConnectionPool {
   bool isSearched = false;  // for those
   [[nodiscard]] URLSessionState& session() { return session_; }
   [[nodiscard]] bool isEmpty() const { return active_ == 0; }
+  [[nodiscard]] size_t connections() const { return connections_.size(); }
   uint64_t routesWhenJudged = 0;  // the number of their last change
-  // Frees itself from the event loop, soon, when nothing is in it.
-  void closeIfIdle();
+  // Frees itself from the event loop when nothing is in it: after a while, or soon when its session has ended and has no
+  // request but `leaving` left, which may be null.
+  void closeIfIdle(const URLTransfer* leaving = nullptr);
+  // It goes on a connection of this pool.
+  void hasBegun(URLTransfer& transfer);
   // Among the idle ones that are kept.
   Links<URLConnectionPool> links;
-  bool isKept = false;
+  size_t keptConnections = 0;  // while it is one of them
 
  private:
   void leaveIdle();
+  void lookAgain(URLTransfer& transfer);
+  [[nodiscard]] bool isConnecting() const;
   static int socketClosed(void* pool, curl_socket_t socket);
   static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
   static int timerChanged(CURLM* multi, long milliseconds, void* pool);
@@ -75,6 +82,7 @@ class URLConnectionPool {
   std::vector<std::shared_ptr<URLConnection>> connections_;  // some of them never come to be
   std::optional<unsigned> certificates_;  // their generation when a server was verified first
   std::vector<CURL*> idleHandles_;
+  ConnectionGrowth growth_;
   Deadline timer_;  // libcurl's
   Deadline idle_;
 };

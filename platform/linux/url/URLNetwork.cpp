@@ -166,8 +166,10 @@ void URLNetwork::run() {
       if (stopping_ && commands_.empty()) break;
     }
     epoll_event events[64];
+    const MonotonicTime before = currentTime();
     const int count = epoll_wait(epoll_.get(), events, 64, waitingTime());
     tools_.now = currentTime();
+    tools_.rested += tools_.now - before;
     tools_.sockets.beginTurn();
     if (tools_.sockets.areSomeRefused()) tools_.sockets.watchRefused();
     for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);

@@ -174,6 +174,7 @@ int URLTransfer::beginOn(void* transfer, char* peer, char* local, int peerPort, 
     if (self.attempt.addresses.empty()) self.attempt.addresses.push_back(chosen->peer());
   }
   self.attempt.hasBegun = true;
+  self.pool->hasBegun(self);
   self.reply_.forgetHeaders();
   return CURL_PREREQFUNC_OK;
 }

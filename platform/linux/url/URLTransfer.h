@@ -91,6 +91,8 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   Links<URLTransfer> links;           // among its session's
   Links<URLTransfer> waitingLinks;    // those of its user that wait, while it waits
   std::shared_ptr<URLTransfer> self;  // keeps it alive while the network thread has it
+  Links<URLTransfer> unbegunLinks;    // those of its pool that have not begun, while isUnbegun
+  bool isUnbegun = false;             // no connection has been found for it
   CURL* handle = nullptr;             // while active
   URLConnectionPool* pool = nullptr;  // while active
   Attempt attempt;

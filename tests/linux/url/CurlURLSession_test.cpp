@@ -147,7 +147,7 @@ TEST_F(CurlURLSession, ClosesIdleConnections) {
 }
 
 TEST_F(CurlURLSession, ClosesTheLongestIdleConnectionsWhenTooManySessionsHaveSome) {
-  options_.maxIdlePools = 2;
+  options_.maxIdleConnections = 2;
   auto one = session(), two = session(), three = session();
   for (URLSession* urls : {one.get(), two.get(), three.get()})
     EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
@@ -162,7 +162,7 @@ TEST_F(CurlURLSession, ClosesTheLongestIdleConnectionsWhenTooManySessionsHaveSom
 }
 
 TEST_F(CurlURLSession, ClosesAllSurplusConnectionsOfABurst) {
-  options_.maxIdlePools = 3;
+  options_.maxIdleConnections = 3;
   server_.setReply(reply(Behaviour::hold));
   std::vector<std::unique_ptr<URLSession>> many(20);
   for (auto& one : many) {
