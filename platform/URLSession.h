@@ -46,6 +46,9 @@ struct URLRequest {
   bool isAwaited = false;
   std::shared_ptr<UserAccount> account;  // of the client's user; null: the daemon's own request
   int maxRedirects = 0;                  // followed only while they stay on https
+  // What the server can tell from the request anyway about who sends it: requests of one identity may let it see that they
+  // come from the same device, those of two never, unless they go through one URL session. Empty: none.
+  std::string identity;
 };
 
 struct URLResponse {

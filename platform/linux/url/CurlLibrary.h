@@ -14,21 +14,24 @@ struct ssl_st;
 struct x509_store_st;
 
 // The one table of libcurl's functions: what each is called here, and there.
-#define KYT_CURL_FUNCTIONS(ROW)              \
-  ROW(globalInit, curl_global_init)          \
-  ROW(globalCleanup, curl_global_cleanup)    \
-  ROW(easyInit, curl_easy_init)              \
-  ROW(easyCleanup, curl_easy_cleanup)        \
-  ROW(easySetOption, curl_easy_setopt)       \
-  ROW(easyGetInfo, curl_easy_getinfo)        \
-  ROW(easyErrorText, curl_easy_strerror)     \
-  ROW(multiInit, curl_multi_init)            \
-  ROW(multiCleanup, curl_multi_cleanup)      \
-  ROW(multiSetOption, curl_multi_setopt)     \
-  ROW(multiAdd, curl_multi_add_handle)       \
-  ROW(multiRemove, curl_multi_remove_handle) \
-  ROW(multiReadInfo, curl_multi_info_read)   \
-  ROW(multiSocketAction, curl_multi_socket_action)
+#define KYT_CURL_FUNCTIONS(ROW)                    \
+  ROW(globalInit, curl_global_init)                \
+  ROW(globalCleanup, curl_global_cleanup)          \
+  ROW(easyInit, curl_easy_init)                    \
+  ROW(easyCleanup, curl_easy_cleanup)              \
+  ROW(easySetOption, curl_easy_setopt)             \
+  ROW(easyGetInfo, curl_easy_getinfo)              \
+  ROW(easyErrorText, curl_easy_strerror)           \
+  ROW(multiInit, curl_multi_init)                  \
+  ROW(multiCleanup, curl_multi_cleanup)            \
+  ROW(multiSetOption, curl_multi_setopt)           \
+  ROW(multiAdd, curl_multi_add_handle)             \
+  ROW(multiRemove, curl_multi_remove_handle)       \
+  ROW(multiReadInfo, curl_multi_info_read)         \
+  ROW(multiSocketAction, curl_multi_socket_action) \
+  ROW(shareInit, curl_share_init)                  \
+  ROW(shareSetOption, curl_share_setopt)           \
+  ROW(shareCleanup, curl_share_cleanup)
 
 namespace kyt {
 

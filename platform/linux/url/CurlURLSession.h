@@ -4,8 +4,9 @@
 //
 // Connections verify their server always (TLS 1.2 or newer), negotiate HTTP/2 over TLS, use no proxy, and are
 // kept alive for the session's next request. A session has one connection to each server; as long as requests wait too
-// long for those there are, their number doubles, up to eight. Completions run on serial queues, one for each user in each
-// session, on worker threads of their own ("kyt-url").
+// long for those there are, their number doubles, up to eight. TLS sessions are taken up again by requests of the same
+// identity (TLSTickets.h). Completions run on serial queues, one for each user in each session, on worker threads of
+// their own ("kyt-url").
 //
 // A request is sent once: libcurl would send it again, up to five times, when a kept connection ends under it, and no
 // option forbids that. It goes again only where the server's TCP has acknowledged not a byte of it (URLConnection.h), on

@@ -11,6 +11,7 @@
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/RequestFigures.h"
 #include "platform/linux/url/RouteTable.h"
+#include "platform/linux/url/TLSTickets.h"
 #include "platform/linux/url/WatchedSockets.h"
 #include "platform/queues/Log.h"
 
@@ -37,6 +38,7 @@ struct NetworkTools {
   WatchedSockets sockets;
   RouteTable routes;
   CertificateStore certificates;
+  TLSTickets tickets;
   std::optional<CurlLibrary> curl;  // loaded, once there is a pool
 };
 

@@ -113,15 +113,31 @@ bool URLConnectionPool::mayResume(const URLTransfer& transfer) {
   return *certificates_ == generation;
 }
 
+// The server tells those of one identity from others by what they say, so a ticket tells it nothing more.
+std::shared_ptr<CURLSH> URLConnectionPool::ticketsFor(const URLTransfer& transfer) {
+  const std::string& identity = transfer.request.identity;
+  if (!identity.empty())
+    return tools_.tickets.of(curl_, identity, tools_.certificates.generation(), routesWhenJudged, tools_.now);
+  if (!tickets_) tickets_ = TLSTickets::make(curl_);
+  return tickets_;
+}
+
 CURLcode URLConnectionPool::add(URLTransfer& transfer) {
   CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
   if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
+  transfer.tickets = ticketsFor(transfer);
+  if (!transfer.tickets) {
+    curl_.easyCleanup(handle);
+    return CURLE_OUT_OF_MEMORY;
+  }
   transfer.pool = this;
   transfer.configure(handle);
+  curl_.easySetOption(handle, CURLOPT_SHARE, transfer.tickets.get());
   curl_.easySetOption(handle, CURLOPT_SSL_SESSIONID_CACHE, mayResume(transfer) ? 1L : 0L);
   if (curl_.multiAdd(multi_, handle) != CURLM_OK) {
     transfer.pool = nullptr;
     curl_.easyCleanup(handle);
+    transfer.tickets.reset();
     return CURLE_FAILED_INIT;
   }
   transfer.handle = handle;
@@ -134,6 +150,8 @@ CURLcode URLConnectionPool::add(URLTransfer& transfer) {
 void URLConnectionPool::remove(URLTransfer& transfer) {
   CURL* handle = std::exchange(transfer.handle, nullptr);
   curl_.multiRemove(multi_, handle);
+  curl_.easySetOption(handle, CURLOPT_SHARE, nullptr);
+  transfer.tickets.reset();
   transfer.leaveConnection();
   growth_.leave(transfer);
   transfer.pool = nullptr;

@@ -63,6 +63,7 @@ class URLConnectionPool {
   void leaveIdle();
   void lookAgain(URLTransfer& transfer);
   [[nodiscard]] bool isConnecting() const;
+  [[nodiscard]] std::shared_ptr<CURLSH> ticketsFor(const URLTransfer& transfer);
   static int socketClosed(void* pool, curl_socket_t socket);
   static int socketChanged(CURL* handle, curl_socket_t socket, int what, void* pool, void*);
   static int timerChanged(CURLM* multi, long milliseconds, void* pool);
@@ -81,6 +82,7 @@ class URLConnectionPool {
   bool isRetired_ = false;
   std::vector<std::shared_ptr<URLConnection>> connections_;  // some of them never come to be
   std::optional<unsigned> certificates_;  // their generation when a server was verified first
+  std::shared_ptr<CURLSH> tickets_;       // of requests without an identity
   std::vector<CURL*> idleHandles_;
   ConnectionGrowth growth_;
   Deadline timer_;  // libcurl's

@@ -175,6 +175,7 @@ void URLNetwork::run() {
     for (int i = 0; i < count; ++i) handleEvent(events[i].data.u64, events[i].events);
   }
   requests_.closeAllPools();
+  tools_.tickets.forget();
   if (tools_.curl) tools_.curl->globalCleanup();
   MutexLock lock(mutex_);
   threadEnds_ = true;

@@ -94,6 +94,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   Links<URLTransfer> unbegunLinks;    // those of its pool that have not begun, while isUnbegun
   bool isUnbegun = false;             // no connection has been found for it
   CURL* handle = nullptr;             // while active
+  std::shared_ptr<CURLSH> tickets;    // while active: the TLS sessions that it may take up again
   URLConnectionPool* pool = nullptr;  // while active
   Attempt attempt;
   size_t waitingCharge = 0;      // while waiting

@@ -43,6 +43,15 @@ TEST_F(PostRequestTest, AMessageHasItsTimeItsClientAndItsRecords) {
   EXPECT_EQ(made.events, 2u);
 }
 
+// So that no TLS ticket links what its message does not.
+TEST_F(PostRequestTest, ARequestHasTheIdentityThatItsMessageNames) {
+  EXPECT_EQ(request().identity, "an identifier");
+  facts_.clientID = String("another");
+  EXPECT_EQ(request().identity, "another");
+  facts_.clientID = std::nullopt;
+  EXPECT_EQ(request().identity, "");
+}
+
 TEST_F(PostRequestTest, WithoutAClientIDTheRecordsAreLostAndCount) {
   facts_.clientID = std::nullopt;
   const PostRequest::Message made = message(Array{Dictionary{{"k", 1}}, Dictionary{{"k", 2}}});
