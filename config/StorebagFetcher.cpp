@@ -52,18 +52,12 @@ int32_t maxAgeFromCacheControl(std::optional<std::string_view> header) {
   return kMaxStorebagAge;
 }
 
-const String* stringEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->string() : nullptr;
-}
-
 const Dictionary* sectionEntry(const Dictionary& bag, const std::optional<String>& name) {
-  const Value* value = name ? bag.find(*name) : nullptr;
-  return value != nullptr ? value->dictionary() : nullptr;
+  return name ? bag.dictionary(*name) : nullptr;
 }
 
 std::optional<Data> decodedEntry(const Dictionary& dictionary, const char* key, Log& log) {
-  const String* text = stringEntry(dictionary, key);
+  const String* text = dictionary.string(key);
   std::optional<Data> bytes;
   if (text == nullptr)
     log.normal("fetchStorebagWithName: The storebag's \"%s\" is missing or no text", key);
@@ -192,7 +186,7 @@ std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply) {
     log.error("fetchStorebagWithName: propertyListWithData error %s", error->localizedDescription.c_str());
   const Value* root = std::get_if<Value>(&document);
   const Dictionary* dictionary = root != nullptr ? root->dictionary() : nullptr;
-  if (dictionary == nullptr || stringEntry(*dictionary, "signature") == nullptr) {
+  if (dictionary == nullptr || dictionary->string("signature") == nullptr) {
     log.error("fetchStorebagWithName: Signature is missing");
     return std::nullopt;
   }
@@ -230,7 +224,7 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
   if (section == nullptr) return fetch;
 
   // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
-  const String* version = stringEntry(*bag, "version");
+  const String* version = bag->string("version");
   if (version == nullptr) {
     log.normal(
         "fetchStorebagForEnvironmentAndClientType: The storebag for client type %d has no text \"version\"",

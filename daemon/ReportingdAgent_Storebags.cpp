@@ -27,20 +27,17 @@ constexpr char kFailure[] = "Fetch Failure";
 
 int32_t clientTypeOf(const ReportingdSession& session) {
   const std::optional<Dictionary>& info = session.sessionInfo();
-  const Value* type = info ? info->find(kKYTReportingSessionInfoClientType) : nullptr;
-  return type != nullptr ? type->intValue() : 0;
+  return info ? info->integer(kKYTReportingSessionInfoClientType) : 0;
 }
 
 std::optional<String> stringEntry(const Dictionary& entry, const char* key) {
-  const Value* value = entry.find(key);
-  if (value == nullptr || value->string() == nullptr) return std::nullopt;
-  return *value->string();
+  const String* text = entry.string(key);
+  return text != nullptr ? std::optional(*text) : std::nullopt;
 }
 
 std::optional<Dictionary> sectionOf(const Dictionary& entry) {
-  const Value* data = entry.find(kData);
-  if (data == nullptr || !data->isDictionary()) return std::nullopt;
-  return *data->dictionary();
+  const Dictionary* section = entry.dictionary(kData);
+  return section != nullptr ? std::optional(*section) : std::nullopt;
 }
 
 // Whether the entry is used as it is, with the reason in the log: it is fresh, or it failed a short while ago.
@@ -64,8 +61,7 @@ bool entryHolds(const Dictionary& entry, int32_t clientType, Platform& platform)
 }  // namespace
 
 const Dictionary* ReportingdAgent::cachedEntry(const std::optional<String>& name) const {
-  const Value* entry = name ? _cachedStorebags.find(*name) : nullptr;
-  return entry != nullptr ? entry->dictionary() : nullptr;
+  return name ? _cachedStorebags.dictionary(*name) : nullptr;
 }
 
 std::optional<Dictionary> ReportingdAgent::storebagForSession(ReportingdSession& session) {

@@ -27,15 +27,10 @@ constexpr uint16_t kInternalMethod = 0;
 constexpr uint16_t kStartMessage = 0;
 constexpr uint16_t kStopMessage = 1;
 
-const String* stringEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->string() : nullptr;
-}
-
 // A missing value on the new side never equals, not even a missing one.
 bool isSameName(const std::optional<Dictionary>& newInfo, const Dictionary& oldInfo, const char* key) {
-  const String* newName = newInfo ? stringEntry(*newInfo, key) : nullptr;
-  const String* oldName = stringEntry(oldInfo, key);
+  const String* newName = newInfo ? newInfo->string(key) : nullptr;
+  const String* oldName = oldInfo.string(key);
   return newName != nullptr && oldName != nullptr && *newName == *oldName;
 }
 
@@ -80,9 +75,7 @@ std::string ReportingdSession::description() const {
 }
 
 bool ReportingdSession::requiresUserInfo() const {
-  const Value* required =
-      _sessionInfo ? _sessionInfo->find(kKYTReportingSessionInfoRequireUserInfo) : nullptr;
-  return required != nullptr && required->boolValue();
+  return _sessionInfo && _sessionInfo->boolean(kKYTReportingSessionInfoRequireUserInfo);
 }
 
 // The exchange makes sure that either the report that has just asked saw the change, or the next one is told.
@@ -94,30 +87,25 @@ void ReportingdSession::figuresMayHaveChanged() {
 // that never had a token is found by nobody, and does not wait for the monitor, which somebody's download may hold.
 void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
   countMistakes(sessionInfo, platform());
-  const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
-  const Value* token = sessionInfo.find(kKYTReportingSessionInfoHierarchyToken);
-  const Value* type = sessionInfo.find(kKYTReportingSessionInfoClientType);
-  const Dictionary* hierarchy = token != nullptr ? token->dictionary() : nullptr;
+  const Dictionary* hierarchy = sessionInfo.dictionary(kKYTReportingSessionInfoHierarchyToken);
   const Value* tokenID = hierarchy != nullptr ? hierarchy->find(kKYTReportingHierarchyTokenTokenID) : nullptr;
   if (tokenID != nullptr && !tokenID->isNull()) wasInHierarchy_ = true;
   std::optional<MonitorLock> lock;
   if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
-  _sessionID = sessionID != nullptr ? sessionID->unsignedIntValue() : 0;
+  _sessionID = sessionInfo.unsignedInteger(kKYTReportingSessionInfoSessionID);
   _sessionInfo = sessionInfo;
   _hierarchyDictionary.reset();
   if (hierarchy != nullptr) _hierarchyDictionary = *hierarchy;
-  clientType_.store(type != nullptr ? type->intValue() : 0, std::memory_order_relaxed);
+  clientType_.store(sessionInfo.integer(kKYTReportingSessionInfoClientType), std::memory_order_relaxed);
   figuresMayHaveChanged();
   _sessionDelegate.updateCorrelatedSessions(*this);
 }
 
 void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
                                        Value frameworksToCheck, bool hasAggregationBlock) {
-  const Value* sessionID = sessionInfo.find(kKYTReportingSessionInfoSessionID);
   log().debug("setSessionInfo: Configuring session %u",
-              sessionID != nullptr ? sessionID->unsignedIntValue() : 0);
-  const Value* required = sessionInfo.find(kKYTReportingSessionInfoRequireUserInfo);
-  if (userInfo && (required == nullptr || !required->boolValue()))
+              sessionInfo.unsignedInteger(kKYTReportingSessionInfoSessionID));
+  if (userInfo && !sessionInfo.boolean(kKYTReportingSessionInfoRequireUserInfo))
     log().error("setSessionInfo: Configure session: user info provided without requiring it");
   takeOverIdentity(sessionInfo);
   _frameworks = std::move(frameworksToCheck);

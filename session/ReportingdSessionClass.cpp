@@ -14,11 +14,6 @@ namespace kyt {
 
 namespace {
 
-bool boolEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr && value->boolValue();
-}
-
 // Nobody waits for what the back ends return for a single message.
 class MessageLogReader final : public AnswerReader {
  public:
@@ -82,7 +77,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
     platform().counters.add(Reason::noBackEnds);
     return;
   }
-  if (userInfo && !boolEntry(*sessionInfo, kKYTReportingSessionInfoRequireUserInfo))
+  if (userInfo && !sessionInfo->boolean(kKYTReportingSessionInfoRequireUserInfo))
     log.error("sendMessageWithSessionInfo: user info provided without requiring it.");
 
   const std::shared_ptr<ReportingSessionConnectivityHelper> helper = singleMessageHelper();

@@ -41,8 +41,7 @@ bool isOdd(const Value& value) {
 }
 
 int32_t clientTypeIn(const std::optional<Dictionary>& sessionInfo) {
-  const Value* type = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoClientType) : nullptr;
-  return type != nullptr ? type->intValue() : 0;
+  return sessionInfo ? sessionInfo->integer(kKYTReportingSessionInfoClientType) : 0;
 }
 
 }  // namespace
@@ -95,8 +94,8 @@ Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!toldOddNumbers_ && (isOdd(*category) || isOdd(*type))) tellOddNumbers(*category, *type);
   const auto method = static_cast<uint16_t>(category->unsignedIntValue());
   const auto respCode = static_cast<uint16_t>(type->unsignedIntValue());
-  const Value* flag = message.find(kKYTReportingMessageParametersFlag);
-  const auto messageFlag = MessageFlag{flag != nullptr ? static_cast<int32_t>(flag->unsignedIntValue()) : 0};
+  const auto messageFlag =
+      MessageFlag{static_cast<int32_t>(message.unsignedInteger(kKYTReportingMessageParametersFlag))};
   Value payloadValue = message.take(kKYTReportingMessageParametersPayload);
   Dictionary* payload = payloadValue.mutableDictionary();
   const TimeValue timestamp = platform().clock.timeOfDay();

@@ -27,9 +27,8 @@ std::optional<Array> ReportingdSession::fetchReportingStates() const {
 }
 
 uint32_t ReportingdSession::hierarchyLevel() const {
-  const Value* level =
-      _hierarchyDictionary ? _hierarchyDictionary->find(kKYTReportingHierarchyTokenLevel) : nullptr;
-  return level != nullptr ? static_cast<uint32_t>(level->intValue()) : 0;
+  if (!_hierarchyDictionary) return 0;
+  return static_cast<uint32_t>(_hierarchyDictionary->integer(kKYTReportingHierarchyTokenLevel));
 }
 
 std::optional<String> ReportingdSession::hierarchyToken() const {

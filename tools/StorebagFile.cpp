@@ -63,28 +63,22 @@ std::optional<std::string> signature(EVP_PKEY* key, std::string_view bytes) {
   return out;
 }
 
-const Dictionary* dictionaryAt(const Dictionary& dictionary, std::string_view key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->dictionary() : nullptr;
-}
-
 void warnAboutFilters(const Dictionary& client, const std::string& where, std::vector<std::string>& out) {
-  const Value* filters = client.find("filters");
-  if (filters == nullptr || filters->array() == nullptr) {
+  const Array* filters = client.array("filters");
+  if (filters == nullptr) {
     out.push_back(where + ": no \"filters\" array: sessions that require user information are disabled");
     return;
   }
   size_t index = 0;
-  for (const Value& element : *filters->array()) {
+  for (const Value& element : *filters) {
     const std::string at = where + ", filter " + std::to_string(index++);
     const Dictionary* filter = element.dictionary();
     if (filter == nullptr) {
       out.push_back(at + ": not a dictionary");
       continue;
     }
-    const Value* action = filter->find("action");
-    const String* text = action != nullptr ? action->string() : nullptr;
-    if (text == nullptr || (*text != "remove" && *text != "sha256"))
+    const String* action = filter->string("action");
+    if (action == nullptr || (*action != "remove" && *action != "sha256"))
       out.push_back(at + ": the action is neither \"remove\" nor \"sha256\" (case counts): the key is kept");
     if (!filter->contains("key")) out.push_back(at + ": no \"key\": it matches nothing");
     if (filter->contains("method") || filter->contains("status"))
@@ -112,21 +106,21 @@ void warnAboutWhatStays(const Array& clients, const std::string& where, std::vec
 }
 
 void warnAboutClients(const Dictionary& backend, const std::string& where, std::vector<std::string>& out) {
-  const Value* clients = backend.find("clients");
-  if (clients == nullptr || clients->array() == nullptr) {
+  const Array* clients = backend.array("clients");
+  if (clients == nullptr) {
     out.push_back(where + ": no \"clients\" array: the back end is not created");
     return;
   }
   size_t index = 0;
-  for (const Value& element : *clients->array()) {
+  for (const Value& element : *clients) {
     const std::string at = where + ", client " + std::to_string(index++);
     const Dictionary* client = element.dictionary();
     if (client == nullptr) {
       out.push_back(at + ": not a dictionary");
       continue;
     }
-    const Value* locales = client->find("locale_whitelist");
-    if (locales == nullptr || locales->array() == nullptr || locales->array()->empty())
+    const Array* locales = client->array("locale_whitelist");
+    if (locales == nullptr || locales->empty())
       out.push_back(at + ": no \"locale_whitelist\": sessions that require user information are disabled");
     if (!client->contains("sampling_threshold") && !client->contains("per_country_sampling_thresholds"))
       out.push_back(at + ": no \"sampling_threshold\": sessions that require user information are disabled");
@@ -136,7 +130,7 @@ void warnAboutClients(const Dictionary& backend, const std::string& where, std::
                     ": no \"event_threshold\": it is 0, and nearly every batched event flushes the batch");
     warnAboutFilters(*client, at, out);
   }
-  warnAboutWhatStays(*clients->array(), where, out);
+  warnAboutWhatStays(*clients, where, out);
 }
 
 }  // namespace
@@ -184,8 +178,8 @@ std::variant<Dictionary, Error> StorebagFile::open(std::string_view document,
   const Dictionary* root = std::get<Value>(parsed).dictionary();
   if (root == nullptr) return failure("the root of a storebag is a dictionary");
   const auto decoded = [root](std::string_view key) -> std::optional<Data> {
-    const Value* value = root->find(key);
-    return value != nullptr && value->isString() ? base64Decode(*value->string()) : std::nullopt;
+    const String* text = root->string(key);
+    return text != nullptr ? base64Decode(*text) : std::nullopt;
   };
   const std::optional<Data> signed_ = decoded("signature"), bag = decoded("bag");
   if (!signed_ || !bag) return failure("\"signature\" and \"bag\" must be base64 texts");
@@ -206,11 +200,11 @@ std::vector<std::string> StorebagFile::warnings(const Dictionary& bag) {
     out.emplace_back("\"refresh_cycle\" is over 86400 seconds: it counts as 86400");
   bool any = false;
   for (const char* section : {"development", "vantu_internal", "seed", "release"}) {
-    const Dictionary* table = dictionaryAt(bag, section);
+    const Dictionary* table = bag.dictionary(section);
     if (table == nullptr) continue;
     any = true;
     for (const char* name : {"httppost", "httppost2", "qrs"})
-      if (const Dictionary* backend = dictionaryAt(*table, name))
+      if (const Dictionary* backend = table->dictionary(name))
         warnAboutClients(*backend, std::string(section) + "/" + name, out);
   }
   if (!any) out.emplace_back("no section: development, vantu_internal, seed or release");

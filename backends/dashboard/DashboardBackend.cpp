@@ -22,13 +22,8 @@ constexpr Duration kLeeway = std::chrono::milliseconds(100);
 constexpr size_t kMaxAddressText = 16;
 constexpr int kMostThatCameEarlier = 1024;  // more than a socket holds
 
-const String* textOf(const Dictionary& profile, const char* key) {
-  const Value* value = profile.find(key);
-  return value != nullptr ? value->string() : nullptr;
-}
-
 std::optional<String> entryOf(const std::optional<Dictionary>& profile, const char* key) {
-  const String* text = profile ? textOf(*profile, key) : nullptr;
+  const String* text = profile ? profile->string(key) : nullptr;
   return text != nullptr ? std::optional(*text) : std::nullopt;
 }
 
@@ -38,8 +33,7 @@ bool has(const Dictionary& profile, const char* key) {
 }
 
 uint16_t portOf(const Dictionary& profile) {
-  const Value* port = profile.find("port");
-  return port != nullptr ? static_cast<uint16_t>(port->intValue()) : uint16_t{0};
+  return static_cast<uint16_t>(profile.integer("port"));
 }
 
 // A text that is no address becomes one that no connect() accepts.
@@ -55,7 +49,7 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
   std::optional<String> serverIP;
   uint16_t serverPort = 0;
   if (profile) {
-    if (const String* ip = textOf(*profile, "ip")) serverIP = *ip;
+    if (const String* ip = profile->string("ip")) serverIP = *ip;
     serverPort = portOf(*profile);
   }
   return initWithName(platform, name, profile, serverIP, serverPort, facts);
@@ -74,7 +68,7 @@ std::shared_ptr<DashboardBackend> DashboardBackend::initWithName(Platform& platf
                                                                  const std::optional<String>& serverIP,
                                                                  uint16_t serverPort,
                                                                  const SharedSessionFacts& facts) {
-  if (profile && textOf(*profile, "ip") == nullptr) {
+  if (profile && profile->string("ip") == nullptr) {
     platform.log.error("DashboardBackend(initWithName): can't resolve server IP");
     return nullptr;
   }
@@ -122,7 +116,7 @@ bool DashboardBackend::start(const std::optional<Dictionary>& profile, const std
   uint32_t address = kNoIPv4Address;
   uint16_t port = serverPort;
   if (profile) {
-    address = addressOf(*textOf(*profile, "ip"));
+    address = addressOf(*profile->string("ip"));
     port = portOf(*profile);
     readProfile(*profile);
   } else if (serverIP) {

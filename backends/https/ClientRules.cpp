@@ -23,21 +23,6 @@ double asShown(const Value& threshold) {
   return static_cast<float>(threshold.doubleValue());
 }
 
-const String* textEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->string() : nullptr;
-}
-
-const Array* arrayEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->array() : nullptr;
-}
-
-int32_t intEntry(const Dictionary& dictionary, const char* key) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->intValue() : 0;
-}
-
 // A comma-separated list. An empty text is a missing list; pieces are not trimmed, and an empty one matches
 // nothing.
 Array pieces(const String* list) {
@@ -57,11 +42,11 @@ std::string shown(const Array* list) {
 
 // The threshold of the first element of the list whose countries hold this one; null when none does.
 const Dictionary* countrySampling(const Dictionary& entry, const String* country) {
-  const Array* thresholds = arrayEntry(entry, "per_country_sampling_thresholds");
+  const Array* thresholds = entry.array("per_country_sampling_thresholds");
   if (thresholds == nullptr || country == nullptr) return nullptr;
   for (const Value& element : *thresholds) {
     const Dictionary* threshold = element.dictionary();
-    const Array* countries = threshold != nullptr ? arrayEntry(*threshold, "country") : nullptr;
+    const Array* countries = threshold != nullptr ? threshold->array("country") : nullptr;
     if (countries != nullptr &&
         std::find(countries->begin(), countries->end(), Value(*country)) != countries->end())
       return threshold;
@@ -75,14 +60,14 @@ ClientRules::ClientRules(Platform& platform, Facts facts) : platform_(platform),
 
 bool ClientRules::matchClientNameAndServiceID(const Dictionary& client, const String* clientName,
                                               const String* serviceID) {
-  const Array names = pieces(textEntry(client, "client"));
-  const Array services = pieces(textEntry(client, "service"));
+  const Array names = pieces(client.string("client"));
+  const Array services = pieces(client.string("service"));
   return matchExactStringWithList(&names, clientName, true) &&
          matchStringWithList(&services, serviceID, true);
 }
 
 bool ClientRules::isFrameworkEnabledForClient(const Dictionary& client) const {
-  const String* enabledSince = textEntry(client, "enabledSince");
+  const String* enabledSince = client.string("enabledSince");
   if (enabledSince == nullptr) return true;
   return facts_.session->selfVersion >= versionParts(*enabledSince);
 }
@@ -91,7 +76,7 @@ bool ClientRules::updatePostLink(Decision& decision, const Dictionary& client) c
   bool taken = false;
   if (!decision.useDefaultPostURL || !decision.postURL) {
     decision.useDefaultPostURL = false;
-    if (const String* url = textEntry(client, "post_url")) {
+    if (const String* url = client.string("post_url")) {
       decision.postURL = *url;
       taken = true;
       platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for postURL", url->c_str());
@@ -99,7 +84,7 @@ bool ClientRules::updatePostLink(Decision& decision, const Dictionary& client) c
   }
   if (!decision.useDefaultRealtimePostURL || !decision.realtimePostURL) {
     decision.useDefaultRealtimePostURL = false;
-    if (const String* url = textEntry(client, "realtime_post_url")) {
+    if (const String* url = client.string("realtime_post_url")) {
       decision.realtimePostURL = *url;
       platform_.log.debug("HTTPSPostBackend(updatePostLink): Storebag '%s' for realtimePostURL",
                           url->c_str());
@@ -113,9 +98,9 @@ bool ClientRules::updatePostLink(Decision& decision, const Dictionary& client) c
 }
 
 void ClientRules::resetBackendStateWithClient(Decision& decision, const Dictionary* client) const {
-  decision.eventThreshold = client != nullptr ? intEntry(*client, "event_threshold") : 0;
+  decision.eventThreshold = client != nullptr ? client->integer("event_threshold") : 0;
   platform_.log.debug("resetBackendStateWithClient: event_threshold set to %d", decision.eventThreshold);
-  decision.extrasOnInternal = client != nullptr ? intEntry(*client, "extras_on_internal") : 0;
+  decision.extrasOnInternal = client != nullptr ? client->integer("extras_on_internal") : 0;
   platform_.log.debug("setBackendStateWithClient: extras on internal is set to %d",
                       decision.extrasOnInternal);
 }
@@ -128,8 +113,8 @@ int32_t ClientRules::decide(Decision& decision, const Dictionary* userInfo, std:
   if (!facts_.clients) return kBackendStateDisabled;
   Client client;
   if (userInfo != nullptr)
-    client = {textEntry(*userInfo, kKYTReportingUserInfoClientName),
-              textEntry(*userInfo, kKYTReportingUserInfoServiceName)};
+    client = {userInfo->string(kKYTReportingUserInfoClientName),
+              userInfo->string(kKYTReportingUserInfoServiceName)};
   applyExpedite(decision, client);
   if (!facts_.session->requireUserInfo) return enableWithoutUserInfo(decision);
   if (userInfo == nullptr || userInfo->empty()) return kBackendStateUndecided;
@@ -151,7 +136,7 @@ void ClientRules::applyExpedite(Decision& decision, const Client& client) const 
     const Dictionary* entry = element.dictionary();
     if (entry == nullptr || !matchClientNameAndServiceID(*entry, client.name, client.service)) continue;
     if (entry->contains("expedite")) {
-      decision.batchEvents = intEntry(*entry, "expedite") == 0;
+      decision.batchEvents = entry->integer("expedite") == 0;
       platform_.log.debug("HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d",
                           *decision.batchEvents);
     }
@@ -185,7 +170,7 @@ const Dictionary* ClientRules::chosenEntry(const Client& client) const {
 bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const Client& client,
                               const String* country) const {
   if (!passesConsent(decision, entry, client) || !passesLists(entry, client, country)) return false;
-  const Array* filters = arrayEntry(entry, "filters");
+  const Array* filters = entry.array("filters");
   if (filters == nullptr) {
     platform_.log.error("HTTPSPostBackend(updateBackendState): filters are required.");
     return false;
@@ -195,7 +180,7 @@ bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const
 }
 
 bool ClientRules::passesConsent(Decision& decision, const Dictionary& entry, const Client& client) const {
-  const int32_t overrideDnu = intEntry(entry, "override_dnu");
+  const int32_t overrideDnu = entry.integer("override_dnu");
   if (overrideDnu == 1) {
     decision.dnuType = facts_.dnuEnabled ? 2 : 1;
     return true;
@@ -211,7 +196,7 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
   Log& log = platform_.log;
   // The list is required, so it is matched by the rule that fails without one. By the same rule a device
   // whose country is not known passes: deliberate, servers count on hearing from those.
-  const Array* locales = arrayEntry(entry, "locale_whitelist");
+  const Array* locales = entry.array("locale_whitelist");
   if (!matchStringWithList(locales, country, false)) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
@@ -220,7 +205,7 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
     return false;
   }
   const String* family = facts_.session->productFamily ? &*facts_.session->productFamily : nullptr;
-  const Array* devices = arrayEntry(entry, "device_whitelist");
+  const Array* devices = entry.array("device_whitelist");
   if (!matchStringWithList(devices, family, true)) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s",
@@ -229,7 +214,7 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
     return false;
   }
   const String* hardware = facts_.session->hardwareType ? &*facts_.session->hardwareType : nullptr;
-  const Array* excluded = arrayEntry(entry, "device_blacklist");
+  const Array* excluded = entry.array("device_blacklist");
   if (matchStringWithList(excluded, hardware, false)) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s",
@@ -278,17 +263,17 @@ void ClientRules::takeSettings(Decision& decision, const Dictionary& entry, cons
               facts_.name.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), state,
               facts_.samplingFactor);
   updatePostLink(decision, entry);
-  if (const Array* list = arrayEntry(entry, "event_whitelist")) {
+  if (const Array* list = entry.array("event_whitelist")) {
     decision.eventWhitelist = *list;
     log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@",
                      {Value(facts_.name), Value(*list)});
   }
-  if (const Array* list = arrayEntry(entry, "event_blacklist")) {
+  if (const Array* list = entry.array("event_blacklist")) {
     decision.eventBlacklist = *list;
     log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@",
                      {Value(facts_.name), Value(*list)});
   }
-  decision.shouldUseWiFiOnly = intEntry(entry, "use_wifi_only") != 0;
+  decision.shouldUseWiFiOnly = entry.integer("use_wifi_only") != 0;
 }
 
 // Each decision's own line is at the debug level; whoever runs the device sees one a minute without it.

@@ -35,11 +35,6 @@ bool matchList(const Array* list, const String* wholeString, bool whitelist, Mat
   });
 }
 
-int32_t intEntry(const Dictionary& dictionary, const char* key, int32_t absent) {
-  const Value* value = dictionary.find(key);
-  return value != nullptr ? value->intValue() : absent;
-}
-
 // What is hashed for a value: its own text, or the text that a reader would see posted. None for what could
 // not be posted and must not leave unhashed.
 std::optional<String> textToHash(const Value& value) {
@@ -84,21 +79,19 @@ void EventFilters::createFiltersFromArray(const Array& filters) {
   for (const Value& element : filters) {
     Filter filter;
     if (const Dictionary* dictionary = element.dictionary()) {
-      filter.method = intEntry(*dictionary, "method", -1);
-      filter.status = intEntry(*dictionary, "status", -1);
+      filter.method = dictionary->integer("method", -1);
+      filter.status = dictionary->integer("status", -1);
       asksMethod_ |= filter.method >= 0;
       asksStatus_ |= filter.status >= 0;
-      const Value* key = dictionary->find("key");
-      if (key != nullptr && key->string() != nullptr) {
-        filter.foldedKey = foldCase(*key->string());
+      if (const String* key = dictionary->string("key")) {
+        filter.foldedKey = foldCase(*key);
         filter.sizes = unfoldedSizes(*filter.foldedKey);
         filter.ends = filter.foldedKey->empty() ? 0 : endsOf(*filter.foldedKey);
         addShapes(filter);
       }
-      const Value* action = dictionary->find("action");
-      const String* name = action != nullptr ? action->string() : nullptr;
-      if (name != nullptr && *name == "remove") filter.action = Action::remove;
-      if (name != nullptr && *name == "sha256") filter.action = Action::sha256;
+      const String* action = dictionary->string("action");
+      if (action != nullptr && *action == "remove") filter.action = Action::remove;
+      if (action != nullptr && *action == "sha256") filter.action = Action::sha256;
     }
     filters_.push_back(std::move(filter));
   }
@@ -140,8 +133,7 @@ void EventFilters::filterEvent(Dictionary& event, Digest& digest) const {
 [[gnu::noinline]] bool EventFilters::mustRemove(const Dictionary& event, const String& key, Value& value,
                                                 std::optional<Numbers>& numbers, Digest& digest) const {
   if (!numbers)
-    numbers = Numbers{asksMethod_ ? intEntry(event, "_method", 0) : 0,
-                      asksStatus_ ? intEntry(event, "_status", 0) : 0};
+    numbers = Numbers{asksMethod_ ? event.integer("_method") : 0, asksStatus_ ? event.integer("_status") : 0};
   switch (actionForKey(key, *numbers)) {
     case Action::keep:
       return false;

@@ -25,14 +25,12 @@ Value numberOrMinusOne(Value number) {
 }
 
 std::optional<Array> clientsOf(const Dictionary& profile) {
-  const Value* clients = profile.find("clients");
-  const Array* list = clients != nullptr ? clients->array() : nullptr;
+  const Array* list = profile.array("clients");
   return list != nullptr ? std::optional(*list) : std::nullopt;
 }
 
 std::optional<String> textEntry(const Dictionary* dictionary, const char* key) {
-  const Value* value = dictionary != nullptr ? dictionary->find(key) : nullptr;
-  const String* text = value != nullptr ? value->string() : nullptr;
+  const String* text = dictionary != nullptr ? dictionary->string(key) : nullptr;
   return text != nullptr ? std::optional(*text) : std::nullopt;
 }
 
@@ -175,8 +173,7 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
   }
   Dictionary payload = records_.takePayload(message);
   if (isSessionStop(method, respCode)) addStopEntries(payload);
-  const Value* shared = message.find(kKYTReportingMessageBlobSharedData);
-  const Dictionary* frameworkData = shared != nullptr ? shared->dictionary() : nullptr;
+  const Dictionary* frameworkData = message.dictionary(kKYTReportingMessageBlobSharedData);
   std::optional<String> sessionID;
   if (now.sessionID) sessionID = now.sessionID->text();
   const size_t room = (frameworkData != nullptr ? frameworkData->size() : 0) +

@@ -17,11 +17,6 @@ namespace kyt {
 
 namespace {
 
-int32_t methodOf(const Dictionary& record) {
-  const Value* method = record.find("_method");
-  return method != nullptr ? method->intValue() : 0;
-}
-
 Error localError(const char* text) {
   return Error{kKYTReportingErrorDomain, -1, text};
 }
@@ -33,7 +28,7 @@ void complete(FlushCompletion& completion, Error error) {
 }  // namespace
 
 Value HTTPSPostBackend::batchEvent(Dictionary record) {
-  const int32_t method = methodOf(record);
+  const int32_t method = record.integer("_method");
   uint64_t batched = 0;
   int32_t count = stateQueue().sync([&] {
     stateQueue().assertCurrent();
@@ -199,7 +194,7 @@ void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batc
 }
 
 bool HTTPSPostBackend::admits(const Dictionary& record) const {
-  const auto category = static_cast<uint16_t>(methodOf(record));
+  const auto category = static_cast<uint16_t>(record.integer("_method"));
   if (!isWhitelistedEvent(category)) {
     platform().log.debug(
         "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend %s",

@@ -109,8 +109,7 @@ std::string_view lastPathComponent(std::string_view path) {
 
 std::shared_ptr<UploadBackend> UploadBackend::initWithName(Configuration& configuration, String name,
                                                            Dictionary profile, SharedSessionFacts facts) {
-  const Value* url = profile.find("post_url");
-  const String* postURL = url != nullptr ? url->string() : nullptr;
+  const String* postURL = profile.string("post_url");
   if (postURL == nullptr) {
     configuration.platform.log.error("UploadBackend(initWithName): can't resolve upload post URL.");
     return nullptr;
@@ -124,8 +123,7 @@ UploadBackend::UploadBackend(Making making, Platform& platform, String name, Dic
                              SharedSessionFacts facts, String uploadURL)
     : KYTReportingBackend(making, platform, std::move(name), std::move(profile), std::move(facts)),
       uploadURL_(std::move(uploadURL)) {
-  if (const Value* url = this->profile().find("display_url"); url != nullptr)
-    if (const String* text = url->string()) setDisplayURL(*text);
+  if (const String* text = this->profile().string("display_url")) setDisplayURL(*text);
 }
 
 bool UploadBackend::uploadFileAtPath(const String& path, const String& extensionToken, FileOffer& offer) {

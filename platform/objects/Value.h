@@ -213,6 +213,23 @@ class KYT_OBJECT Dictionary {
     return find(std::string_view(key));
   }
   [[nodiscard]] bool contains(std::string_view key) const noexcept { return find(key) != nullptr; }
+
+  // What stands under a key, as what the caller reads it: any key that find() takes. Null where nothing stands there, or
+  // something else; valid until the dictionary changes.
+  template <typename Key>
+  [[nodiscard]] const String* string(const Key& key) const noexcept;
+  template <typename Key>
+  [[nodiscard]] const Array* array(const Key& key) const noexcept;
+  template <typename Key>
+  [[nodiscard]] const Dictionary* dictionary(const Key& key) const noexcept;
+  // By the readings of Value (intValue(), boolValue()), thus of a text's digits too; `absent` where nothing stands there.
+  template <typename Key>
+  [[nodiscard]] int32_t integer(const Key& key, int32_t absent = 0) const noexcept;
+  template <typename Key>
+  [[nodiscard]] uint32_t unsignedInteger(const Key& key, uint32_t absent = 0) const noexcept;
+  template <typename Key>
+  [[nodiscard]] bool boolean(const Key& key) const noexcept;
+
   [[nodiscard]] const DictionaryEntry* begin() const noexcept;
   [[nodiscard]] const DictionaryEntry* end() const noexcept;
 

@@ -421,6 +421,39 @@ inline const Value* Dictionary::find(const String& key) const noexcept {
   return findSlowly(key);
 }
 
+// Inlined always, like find() of a literal key.
+template <typename Key>
+[[gnu::always_inline]] inline const String* Dictionary::string(const Key& key) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr ? value->string() : nullptr;
+}
+template <typename Key>
+[[gnu::always_inline]] inline const Array* Dictionary::array(const Key& key) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr ? value->array() : nullptr;
+}
+template <typename Key>
+[[gnu::always_inline]] inline const Dictionary* Dictionary::dictionary(const Key& key) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr ? value->dictionary() : nullptr;
+}
+template <typename Key>
+[[gnu::always_inline]] inline int32_t Dictionary::integer(const Key& key, int32_t absent) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr ? value->intValue() : absent;
+}
+template <typename Key>
+[[gnu::always_inline]] inline uint32_t Dictionary::unsignedInteger(const Key& key,
+                                                                   uint32_t absent) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr ? value->unsignedIntValue() : absent;
+}
+template <typename Key>
+[[gnu::always_inline]] inline bool Dictionary::boolean(const Key& key) const noexcept {
+  const Value* value = find(key);
+  return value != nullptr && value->boolValue();
+}
+
 template <typename Key, typename Content>
 inline void Dictionary::append(Key&& key, Content&& value) {
   assert(find(String(key)) == nullptr);

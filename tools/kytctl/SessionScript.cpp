@@ -22,19 +22,8 @@ KeyRule number(std::string_view name, int64_t most, bool required = false) {
 }
 
 std::optional<Dictionary> dictionaryAt(const Dictionary& step, const char* key) {
-  const Value* value = step.find(key);
-  if (value == nullptr || !value->isDictionary()) return std::nullopt;
-  return *value->dictionary();
-}
-
-uint32_t numberAt(const Dictionary& step, const char* key, uint32_t otherwise) {
-  const Value* value = step.find(key);
-  return value != nullptr ? value->unsignedIntValue() : otherwise;
-}
-
-bool isTrue(const Dictionary& step, const char* key) {
-  const Value* value = step.find(key);
-  return value != nullptr && value->boolValue();
+  const Dictionary* value = step.dictionary(key);
+  return value != nullptr ? std::optional(*value) : std::nullopt;
 }
 
 std::optional<std::string> bytesOfHex(const std::string& digits) {
@@ -136,7 +125,7 @@ int SessionScript::open(const Dictionary& step) {
   if (!options.sessionInfo.contains(kKYTReportingSessionInfoClientType))
     return failed("open: session information: \"ClientType\" is missing");
   options.userInfo = dictionaryAt(step, "userInfo");
-  if (isTrue(step, "aggregate"))
+  if (step.boolean("aggregate"))
     options.aggregationBlock = [aggregated = aggregated_](const AggregatedMessage& message) {
       aggregated->print(message);
     };
@@ -159,7 +148,7 @@ int SessionScript::reportCall(const std::shared_ptr<Answer>& answer, const std::
 }
 
 int SessionScript::wait(const Dictionary& step) {
-  if (aggregated_->waitFor(numberAt(step, "messages", 1), connection_.timeoutSeconds)) return 0;
+  if (aggregated_->waitFor(step.unsignedInteger("messages", 1), connection_.timeoutSeconds)) return 0;
   return failed("wait: not so many messages in time");
 }
 
@@ -184,12 +173,12 @@ int SessionScript::send(const Dictionary& step) {
   if (!configured_)
     return failed(
         "send: the daemon drops what comes before the session is configured: {\"do\":\"configure\"}");
-  const auto category = static_cast<uint16_t>(numberAt(step, "category", 0));
-  const auto type = static_cast<uint16_t>(numberAt(step, "type", 0));
-  const uint32_t flag = numberAt(step, "flag", 0);
+  const auto category = static_cast<uint16_t>(step.unsignedInteger("category"));
+  const auto type = static_cast<uint16_t>(step.unsignedInteger("type"));
+  const uint32_t flag = step.unsignedInteger("flag");
   const Dictionary payload = dictionaryAt(step, "payload").value_or(Dictionary());
-  const bool reply = isTrue(step, "reply");
-  for (uint32_t i = numberAt(step, "repeat", 1); i > 0; --i) {
+  const bool reply = step.boolean("reply");
+  for (uint32_t i = step.unsignedInteger("repeat", 1); i > 0; --i) {
     if (reply) {
       if (const int status = sendWithReply(category, type, payload, flag); status != 0) return status;
       continue;
@@ -251,7 +240,7 @@ int SessionScript::digestKey(const Dictionary& step) {
   const auto bytes = bytesOfHex(step.find("hex")->string()->str());
   if (!bytes) return failed("digestKey: \"hex\" is no hex");
   session_->setDigestKey(Data(std::string_view(*bytes)),
-                         static_cast<int32_t>(numberAt(step, "algorithm", 0)));
+                         static_cast<int32_t>(step.unsignedInteger("algorithm")));
   return 0;
 }
 

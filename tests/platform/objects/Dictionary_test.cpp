@@ -63,6 +63,35 @@ TEST(Dictionary, FindsKeysOfEveryLengthThroughEveryOverload) {
   EXPECT_FALSE(dictionary.contains(text));
 }
 
+TEST(Dictionary, ReadsAValueAsTheKindThatIsAskedFor) {
+  const Dictionary dictionary{
+      {"text", "12"}, {"list", Array{1}}, {"inner", Dictionary{{"a", 1}}}, {"no", nullptr}};
+  EXPECT_EQ(*dictionary.string("text"), "12");
+  EXPECT_EQ(dictionary.array("list")->size(), 1u);
+  EXPECT_EQ(dictionary.dictionary(String("inner"))->size(), 1u);
+  for (const char* const key : {"list", "inner", "no", "missing"})
+    EXPECT_EQ(dictionary.string(key), nullptr) << key;
+  for (const char* const key : {"text", "inner", "no", "missing"})
+    EXPECT_EQ(dictionary.array(key), nullptr) << key;
+  for (const char* const key : {"text", "list", "no", "missing"})
+    EXPECT_EQ(dictionary.dictionary(key), nullptr) << key;
+}
+
+TEST(Dictionary, ReadsNumbersAndTruthsAsTheirValuesDo) {
+  const Dictionary dictionary{
+      {"negative", -3}, {"large", 4294967295u}, {"text", "12 apples"}, {"no", nullptr}};
+  EXPECT_EQ(dictionary.integer("negative"), -3);
+  EXPECT_EQ(dictionary.integer("text"), 12);
+  EXPECT_EQ(dictionary.integer("no", 7), Value().intValue()) << "a null is there";
+  EXPECT_EQ(dictionary.integer("missing"), 0);
+  EXPECT_EQ(dictionary.integer("missing", -1), -1);
+  EXPECT_EQ(dictionary.unsignedInteger("large"), 4294967295u);
+  EXPECT_EQ(dictionary.unsignedInteger("missing", 5), 5u);
+  EXPECT_TRUE(dictionary.boolean("negative"));
+  EXPECT_FALSE(dictionary.boolean("no"));
+  EXPECT_FALSE(dictionary.boolean("missing"));
+}
+
 TEST(Dictionary, CopiesItsEntriesOnTheFirstChangeOfASharedBlock) {
   Dictionary a{{"x", 1}, {"y", std::string(40, 'y')}};
   Dictionary b(a);
