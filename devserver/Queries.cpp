@@ -5,6 +5,7 @@
 
 #include "devserver/JsonText.h"
 #include "devserver/Rows.h"
+#include "platform/base/TextEscape.h"
 
 namespace kyt::devserver {
 namespace {

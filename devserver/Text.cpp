@@ -5,31 +5,12 @@
 #include <chrono>
 #include <cmath>
 
+#include "platform/base/TextEscape.h"
+
 namespace kyt::devserver {
 namespace {
 
 constexpr char kHex[] = "0123456789abcdef";
-
-// The length of the well-formed character at the front, or 0.
-size_t characterLength(std::string_view text) {
-  const auto byte = [&](size_t i) { return static_cast<unsigned char>(text[i]); };
-  const unsigned char lead = byte(0);
-  if (lead < 0x80) return 1;
-  const size_t length = lead >= 0xc2 && lead <= 0xdf   ? 2
-                        : (lead & 0xf0) == 0xe0        ? 3
-                        : lead >= 0xf0 && lead <= 0xf4 ? 4
-                                                       : 0;
-  if (length == 0 || text.size() < length) return 0;
-  for (size_t i = 1; i < length; ++i) {
-    if ((byte(i) & 0xc0) != 0x80) return 0;
-  }
-  const unsigned char second = byte(1);
-  if (lead == 0xe0 && second < 0xa0) return 0;  // overlong
-  if (lead == 0xed && second > 0x9f) return 0;  // surrogates
-  if (lead == 0xf0 && second < 0x90) return 0;  // overlong
-  if (lead == 0xf4 && second > 0x8f) return 0;  // past the last code point
-  return length;
-}
 
 void appendEscape(std::string& out, char c) {
   const auto byte = static_cast<unsigned char>(c);
@@ -44,7 +25,7 @@ std::string validText(std::string_view bytes) {
   std::string out;
   out.reserve(bytes.size());
   while (!bytes.empty()) {
-    const size_t length = characterLength(bytes);
+    const size_t length = utf8SequenceLength(bytes);
     if (length == 0) {
       appendEscape(out, bytes.front());
       bytes.remove_prefix(1);
@@ -54,15 +35,6 @@ std::string validText(std::string_view bytes) {
     }
   }
   return out;
-}
-
-bool isValidUTF8(std::string_view bytes) {
-  while (!bytes.empty()) {
-    const size_t length = characterLength(bytes);
-    if (length == 0) return false;
-    bytes.remove_prefix(length);
-  }
-  return true;
 }
 
 std::string printable(std::string_view bytes) {

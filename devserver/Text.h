@@ -11,7 +11,6 @@ namespace kyt::devserver {
 
 // The same text in valid UTF-8: every byte that is part of no well-formed character becomes \xNN.
 [[nodiscard]] std::string validText(std::string_view bytes);
-[[nodiscard]] bool isValidUTF8(std::string_view bytes);
 
 // The text with control characters as \xNN, for terminals.
 [[nodiscard]] std::string printable(std::string_view bytes);

@@ -31,11 +31,7 @@ Value converted(const TomlNode& node) {
     for (const TomlNode& element : *array) out.append(converted(element));
     return out;
   }
-  if (const std::string* text = node.text()) return Value(*text);
-  if (const auto* integer = std::get_if<int64_t>(&node.value)) return Value(*integer);
-  if (const auto* number = std::get_if<double>(&node.value)) return Value(*number);
-  if (const auto* boolean = std::get_if<bool>(&node.value)) return Value(*boolean);
-  return Value();  // a date or a time: bags have none
+  return node.scalar().value_or(Value());  // null for a date or a time: bags have none
 }
 
 }  // namespace

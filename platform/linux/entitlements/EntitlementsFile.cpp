@@ -17,14 +17,6 @@ std::optional<NameOrNumber> nameOrNumber(const TomlNode& node) {
   return std::nullopt;
 }
 
-std::optional<Value> grantedValue(const TomlNode& node) {
-  if (const auto* text = node.text()) return Value(std::string_view(*text));
-  if (const auto* boolean = std::get_if<bool>(&node.value)) return Value(*boolean);
-  if (const auto* integer = std::get_if<int64_t>(&node.value)) return Value(static_cast<long>(*integer));
-  if (const auto* real = std::get_if<double>(&node.value)) return Value(*real);
-  return std::nullopt;
-}
-
 // What is wrong with the entry, or null.
 const char* readEntry(const std::string& key, const TomlNode& node, EntitlementGrant& grant) {
   if (key == "user" || key == "group") {
@@ -44,7 +36,7 @@ const char* readEntry(const std::string& key, const TomlNode& node, EntitlementG
   }
   if (node.table() != nullptr) return "must be a value (the name of an entitlement stands in quotes)";
   if (key.find('.') == std::string::npos) return "is unknown";
-  auto value = grantedValue(node);
+  auto value = node.scalar();
   if (!value) return "must be text, a boolean or a number";
   grant.values.emplace(key, std::move(*value));
   return nullptr;

@@ -9,14 +9,6 @@
 namespace kyt {
 namespace {
 
-std::optional<Value> valueOf(const TomlNode& node) {
-  if (const auto* text = node.text()) return Value(std::string_view(*text));
-  if (const auto* boolean = std::get_if<bool>(&node.value)) return Value(*boolean);
-  if (const auto* integer = std::get_if<int64_t>(&node.value)) return Value(static_cast<long>(*integer));
-  if (const auto* real = std::get_if<double>(&node.value)) return Value(*real);
-  return std::nullopt;
-}
-
 std::string realText(double real) {
   char buffer[40];
   const auto end = std::to_chars(buffer, buffer + sizeof buffer, real).ptr;
@@ -112,7 +104,7 @@ std::variant<FlatToml, TomlError> parseFlatToml(std::string_view text, std::stri
   FlatToml flat;
   flat.text = text;
   for (const auto& [key, node] : std::get<TomlTable>(parsed)) {
-    auto value = valueOf(node);
+    auto value = node.scalar();
     if (!value) return tomlError(name, node.line, "\"" + key + "\" must be text, a boolean or a number");
     flat.entries.emplace(key, FlatTomlEntry{std::move(*value), node.line, node.lastLine});
   }

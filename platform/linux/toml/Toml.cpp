@@ -152,4 +152,12 @@ std::string tomlKey(std::string_view key) {
   return bare ? std::string(key) : tomlQuoted(key);
 }
 
+std::optional<Value> TomlNode::scalar() const {
+  if (const std::string* string = text()) return Value(*string);
+  if (const auto* boolean = std::get_if<bool>(&value)) return Value(*boolean);
+  if (const auto* integer = std::get_if<int64_t>(&value)) return Value(*integer);
+  if (const auto* real = std::get_if<double>(&value)) return Value(*real);
+  return std::nullopt;
+}
+
 }  // namespace kyt

@@ -4,10 +4,13 @@
 
 #include <cstdint>
 #include <map>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <variant>
 #include <vector>
+
+#include "platform/objects/Value.h"
 
 namespace kyt {
 
@@ -24,6 +27,8 @@ struct TomlNode {
   [[nodiscard]] const std::string* text() const { return std::get_if<std::string>(&value); }
   [[nodiscard]] const TomlArray* array() const { return std::get_if<TomlArray>(&value); }
   [[nodiscard]] const TomlTable* table() const { return std::get_if<TomlTable>(&value); }
+  // A text, a truth or a number; none for anything else.
+  [[nodiscard]] std::optional<Value> scalar() const;
 };
 
 // "file:line: what is wrong", in one line of plain text.
