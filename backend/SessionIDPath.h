@@ -24,7 +24,7 @@ struct AncestorIdentifiers {
 class SessionIDPath {
  public:
   // Of a session without ancestors, or a text that is joined already.
-  template <typename Text>
+  template <typename Text>  // NOLINTNEXTLINE(bugprone-forwarding-reference-overload): a path is no such text
   requires std::constructible_from<String, Text> SessionIDPath(
       Text&& identifier)  // NOLINT(google-explicit-constructor): a text is a path
       : identifier_(std::forward<Text>(identifier)) {}

@@ -1,5 +1,5 @@
-// The dashboard's end of the UDP feed: reads every datagram, keeps what it says, and acknowledges those that
-// ask for it, unless a rule says otherwise. One thread, "kyt-feed".
+// The dashboard's end of the UDP feed: reads every datagram, keeps what it says, and acknowledges it if it
+// asks for that, unless a rule says otherwise. One thread, "kyt-feed".
 #pragma once
 
 #include <netinet/in.h>

@@ -27,7 +27,7 @@ class Suspensions {
   // by the connection's own thread. False: it was not suspended, look again.
   [[nodiscard]] bool suspend(MHD_Connection* connection, const Wait& wait, uint64_t generation)
       EXCLUDES(mutex_);
-  // Resumes those that wait for this; a change of the rules resumes all.
+  // Resumes the connections that wait for this; a change of the rules resumes all.
   void wake(WaitFor what) EXCLUDES(mutex_);
   void stop() EXCLUDES(mutex_);  // resumes all, for ever
   [[nodiscard]] bool stopped() EXCLUDES(mutex_);

@@ -1,6 +1,6 @@
 // What each user's clients may hold of the daemon at once, so that a client hurts none but its own user. One place for
-// all such limits, each a row of `kShareRows` and a number in `UserShares`: those that an account counts here, and those
-// that are counted where they are held, by who reads the number here. docs/SECURITY.md has the same table. A user is the
+// all such limits, each a row of `kShareRows` and a number in `UserShares`. An account counts some of them here; the others
+// are counted where they are held, against the number here. docs/SECURITY.md has the same table. A user is the
 // one that the kernel names as the connection's other end, whatever its clients say.
 //
 // Whoever keeps something on behalf of a client takes it from the user's account first, with a Charge where it can,

@@ -188,7 +188,7 @@ TEST_F(Consent, WithItTheSameSessionsReachTheServersThatTheStorebagNames) {
 }
 
 // Users tell the phases apart: what is sent for each goes to an address of its own. A back end
-// that has posted decides no more, so the first session sends nothing before the change.
+// that has posted does not decide again, so the first session sends nothing before the change.
 TEST_F(Consent, AChangeCountsForSessionsThatAreConfiguredAfterIt) {
   setConsent(true);
   startDaemon();

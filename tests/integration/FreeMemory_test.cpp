@@ -46,7 +46,7 @@ TEST(FreeMemory, IsGivenBackAlsoAfterAPostThatEndsWhenAllElseHasLongBeenQuiet) {
     static_cast<void>(client.startFlush());
     ASSERT_TRUE(eventually([&] { return posts == 1; })) << daemon.log();
   }
-  // Workers end when they have been idle for ten seconds, and so do those that ran the storebag's completion.
+  // Workers end when they have been idle for ten seconds, also those which ran the storebag's completion.
   ASSERT_TRUE(eventually(
       [&] { return daemon.threadsNamed("kyt-worker") == 0 && daemon.threadsNamed("kyt-url") == 0; }));
   daemon.count(kyt_failing_malloc_trim);

@@ -1,5 +1,5 @@
-// Descriptors that take for ever to close, passed to the real daemon by clients that it serves and by those that it
-// refuses: they hold nobody but their user's workers.
+// Descriptors that take for ever to close, passed to the real daemon by clients that it serves and by clients that
+// it refuses: they hold nobody but their user's workers.
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <sys/socket.h>

@@ -1,4 +1,4 @@
-// While it lives, this process can open nothing more: the limit on descriptors is below those that are open.
+// While it lives, this process can open nothing more: the limit on descriptors is below the number that are open.
 #pragma once
 
 #include <sys/resource.h>

@@ -16,7 +16,7 @@ struct EntitlementClient {
   [[nodiscard]] static std::variant<EntitlementClient, std::string> ofProcess(int32_t pid);
   [[nodiscard]] static std::variant<EntitlementClient, std::string> ofUser(const std::string& text);
 
-  // True for a process that is no more, whose number may be another's by now.
+  // True once the process has ended; its number may be another's by now.
   [[nodiscard]] bool hasEnded() const;
   [[nodiscard]] std::string groupsText() const;
 

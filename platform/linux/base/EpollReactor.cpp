@@ -38,7 +38,7 @@ constexpr uint64_t kStopEvent = ~uint64_t{0};
 constexpr uint64_t kTimerEvent = kStopEvent - 1;
 constexpr size_t kMostAside = 6;  // queues of one batch that the reactor's thread runs itself
 constexpr Duration kShort = std::chrono::microseconds(50);  // … if they usually take no longer; otherwise one
-constexpr Duration kLongRun = kShort * 4;  // one that was longer (a flush) says no more about the next ones
+constexpr Duration kLongRun = kShort * 4;  // a longer one (a flush) does not count for the next ones
 constexpr Duration kLongest = std::chrono::hours(24 * 365 * 20);  // keeps sums of times in range
 
 uint32_t epollEvents(unsigned events) {

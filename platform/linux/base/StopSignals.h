@@ -1,7 +1,7 @@
 // How a program's main thread sleeps until it is to end: SIGTERM and SIGINT, or a request from inside. Made
 // before any other thread exists, so that no thread of the program takes these signals by their default.
 //
-// From then on no other signal from outside ends the program, but for SIGKILL and those that ask for a core: SIGHUP is
+// From then on no other signal from outside ends the program, but for SIGKILL and the signals that ask for a core: SIGHUP is
 // told, the others are ignored. SIGPIPE among them: a write to a closed socket is an error like any other.
 #pragma once
 

@@ -85,7 +85,7 @@ bool kernelTellsPeerProcess() {
   return true;
 }
 
-// Takes too many descriptors as well: those that find no room are closed by the kernel, within the call.
+// Takes too many descriptors as well: the kernel closes, within the call, what finds no room.
 StreamResult UnixStream::read(std::span<std::byte> buffer, std::vector<Descriptor>& descriptors) {
   iovec piece{buffer.data(), buffer.size()};
   alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostPassed)> control;

@@ -22,7 +22,7 @@ using CapabilitySet = uint64_t;
 // certain.
 [[nodiscard]] int keepCapabilities(CapabilitySet kept);
 
-// The same for the daemon itself, which keeps none. Run by root, which its service does not do, it keeps those that let
+// The same for the daemon itself, which keeps none. Run by root, which its service does not do, it keeps what lets
 // root read and write files of other users: a root below somebody's home folder, user defaults of their owner.
 [[nodiscard]] int giveUpCapabilities();
 

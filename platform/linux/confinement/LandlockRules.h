@@ -29,7 +29,7 @@ class LandlockRules {
   // The rules of that profile, not entered yet. Otherwise why they cannot be.
   [[nodiscard]] static std::variant<LandlockRules, std::string> of(const ConfinementProfile& profile,
                                                                    const Options& options);
-  // No value: they hold for the calling thread and those that it starts, for ever. Precondition: no_new_privs.
+  // No value: they hold for the calling thread and the threads that it starts, for ever. Precondition: no_new_privs.
   [[nodiscard]] std::optional<std::string> enter() const;
   // What this kernel's Landlock does not know, each the end of the sentence "this kernel cannot …".
   [[nodiscard]] const std::vector<std::string>& missing() const { return missing_; }

@@ -31,7 +31,7 @@ struct SystemCallProfile {
   std::map<int, std::vector<SystemCallRule>> errors;  // fail with another error, without a record
 };
 
-// Before the start is over. No value: entered, for the calling thread and those that it starts. Otherwise why
+// Before the start is over. No value: entered, for the calling thread and the threads that it starts. Otherwise why
 // not. Precondition: no_new_privs is set.
 [[nodiscard]] std::optional<std::string> enterSystemCallFilter(const SystemCallProfile& profile);
 // From now on what stands in `untilListening` fails with EPERM.

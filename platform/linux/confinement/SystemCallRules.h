@@ -2,13 +2,13 @@
 // for. The grammar is small, so that a profile reads as a list of what a program may ask of the kernel:
 //
 //   read                              the call, whatever its arguments
-//   451..511                          calls by number, for those that are younger than the libraries here
+//   451..511                          calls by number, if they are younger than the libraries here
 //   socket(AF_UNIX, only SOCK_DGRAM|SOCK_CLOEXEC)
 //                                     the call with such arguments; those past the last one are free
 //
 // An argument is `*` (anything), a value, `NULL`, `SELF` (this process's number), `only A|B` (no bits but
 // these), `has A|B` (all of these), `no A|B` (none of these) or `has A|B no C|D`. A value is a number or one of
-// the kernel's constants; the table in the source has those that make sense in a profile. Pointers cannot be
+// the kernel's constants; the table in the source has what makes sense in a profile. Pointers cannot be
 // followed, so names of files and addresses of sockets are Landlock's part.
 //
 // Used by the profile's parser; the filter itself is SystemCallFilter.

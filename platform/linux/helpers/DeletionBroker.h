@@ -4,8 +4,8 @@
 // A small process ("kyt-broker") is forked before the confinement is entered. It knows one request: an open
 // file, its folder, a name, and whose rights to use; for each it forks a child that takes that user and those
 // groups and nothing else (no capability), checks that the name in that folder is still this very file
-// (device and inode), removes it and answers with errno. A client's file system that never answers holds such
-// a child alone, and a deadline ends it; a user that has many such has no more. Between check and removal the client
+// (device and inode), removes it and returns errno. A client's file system that never answers holds such
+// a child alone, and a deadline ends it; a user that has many such gets no further one. Between check and removal the client
 // could put another file there: that is then removed with its own rights, so nobody but itself is harmed.
 //
 // It believes the daemon whose rights to use, which code that took over the daemon could misuse. So the file must be

@@ -11,7 +11,7 @@
 namespace kyt {
 namespace {
 
-// A setter answers what is wrong with the value, or null. The line and the key are added by the caller.
+// A setter returns what is wrong with the value, or null. The line and the key are added by the caller.
 using Setter = const char* (*)(const TomlNode& node, Settings& settings);
 
 template <uint64_t Limits::*field, uint64_t most = uint64_t{std::numeric_limits<int64_t>::max()}>

@@ -318,7 +318,7 @@ TEST_F(Broker, EndsAChildWhoseFileSystemNeverAnswersAndServesOthersMeanwhile) {
   EXPECT_TRUE(exists("b"));
 }
 
-// As many removals as a user may have at once hang; prints what went wrong with those that come then.
+// As many removals as a user may have at once hang; prints what went wrong with further ones.
 std::string removeAtOnce(const TemporaryFolder& folder) {
   SilentFileSystem silent;
   if (const std::string problem = silent.begin(); !problem.empty()) return "cannot: " + problem;
