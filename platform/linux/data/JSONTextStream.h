@@ -15,7 +15,7 @@ class JSONTextStream {
  public:
   using Ch = char;
 
-  explicit JSONTextStream(std::string& out) : out_(out) {}
+  explicit JSONTextStream(std::string& out) : out_(out), begin_(out.size()) {}
   JSONTextStream(const JSONTextStream&) = delete;
   JSONTextStream& operator=(const JSONTextStream&) = delete;
   ~JSONTextStream() { Flush(); }
@@ -26,6 +26,7 @@ class JSONTextStream {
   }
   void Flush() {
     out_.append(buffer_, static_cast<size_t>(next_ - buffer_));
+    flushed_ = out_.size() - begin_;
     next_ = buffer_;
   }
 
@@ -40,11 +41,30 @@ class JSONTextStream {
     if (text.size() > kSize) {
       Flush();
       out_.append(text);
+      flushed_ += text.size();
       return;
     }
     char* to = room(text.size());
     if (!text.empty()) std::memcpy(to, text.data(), text.size());
     next_ = to + text.size();
+  }
+
+  // How much has been written since the stream was made, and a piece of that once more.
+  [[nodiscard]] size_t position() const { return flushed_ + static_cast<size_t>(next_ - buffer_); }
+  void repeat(size_t from, size_t size) {
+    while (size != 0) {
+      size_t now = size < kSize ? size : kSize;
+      char* to = room(now);
+      if (from < flushed_) {
+        now = now < flushed_ - from ? now : flushed_ - from;
+        std::memcpy(to, out_.data() + begin_ + from, now);
+      } else {
+        std::memcpy(to, buffer_ + (from - flushed_), now);
+      }
+      next_ = to + now;
+      from += now;
+      size -= now;
+    }
   }
 
   // The text in quotation marks, escaped as RapidJSON escapes.
@@ -175,6 +195,8 @@ class JSONTextStream {
   }
 
   std::string& out_;
+  const size_t begin_;  // in `out_`, where this stream began
+  size_t flushed_ = 0;  // so much has gone there
   char* next_ = buffer_;
   char buffer_[kSize];
 };

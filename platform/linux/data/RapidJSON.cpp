@@ -6,11 +6,11 @@
 #include <rapidjson/memorystream.h>
 #include <rapidjson/prettywriter.h>
 #include <rapidjson/reader.h>
-#include <rapidjson/writer.h>
 
 #include <charconv>
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <type_traits>
 #include <vector>
 
@@ -21,19 +21,158 @@
 namespace kyt {
 namespace {
 
+// Numbers as both writers write them. Doubles are the shortest decimal in every case (RapidJSON's algorithm misses some).
+void appendInteger(JSONTextStream& stream, auto number) {
+  char* to = stream.room(24);
+  if constexpr (std::is_signed_v<decltype(number)>) {
+    stream.advance(rapidjson::internal::i64toa(number, to));
+  } else {
+    stream.advance(rapidjson::internal::u64toa(number, to));
+  }
+}
+
+void appendReal(JSONTextStream& stream, double number) {
+  // Without an exponent where people would write none, as decimalText() does.
+  const double magnitude = std::fabs(number);
+  const bool plain = magnitude == 0 || (magnitude >= 1e-6 && magnitude < 1e17);
+  char* to = stream.room(64);
+  const auto result = plain ? std::to_chars(to, to + 64, number, std::chars_format::fixed)
+                            : std::to_chars(to, to + 64, number);
+  stream.advance(result.ptr);
+}
+
+// The compact text. In a list of dictionaries most entries of one are those of the dictionary before, such as a record's
+// constant keys: what is the same, bit for bit, is copied from the text that is there already.
+class CompactWriter {
+ public:
+  explicit CompactWriter(std::string& out) : stream_(out) {}
+
+  void write(const Value& value) {
+    switch (value.kind()) {
+      case Value::Kind::string:
+        return stream_.appendQuoted(value.string()->view());
+      case Value::Kind::integer:
+        return appendInteger(stream_, *value.integer());
+      case Value::Kind::unsignedInteger:
+        return appendInteger(stream_, *value.unsignedInteger());
+      case Value::Kind::boolean:
+        return stream_.append(*value.boolean() ? "true" : "false");
+      case Value::Kind::real:
+        if (std::isfinite(*value.real())) return appendReal(stream_, *value.real());
+        return stream_.append("null");
+      case Value::Kind::dictionary:
+        return dictionary(*value.dictionary());
+      case Value::Kind::array:
+        return array(*value.array());
+      case Value::Kind::null:
+      case Value::Kind::date:
+      case Value::Kind::data:
+        return stream_.append("null");
+    }
+  }
+
+ private:
+  // Where an entry's text begins (behind a comma) and ends.
+  struct Place {
+    size_t begin, end;
+  };
+  using Places = std::vector<Place>;
+
+  void dictionary(const Dictionary& entries) {
+    stream_.Put('{');
+    for (const DictionaryEntry& entry : entries) {
+      if (&entry != entries.begin()) stream_.Put(',');
+      wholeEntry(entry);
+    }
+    stream_.Put('}');
+  }
+
+  void wholeEntry(const DictionaryEntry& entry) {
+    stream_.appendQuoted(entry.key.view());
+    stream_.Put(':');
+    write(entry.value);
+  }
+
+  void array(const Array& elements) {
+    stream_.Put('[');
+    const Dictionary* before = nullptr;
+    Places places, placesBefore;
+    for (const Value& element : elements) {
+      if (&element != elements.begin()) stream_.Put(',');
+      const Dictionary* record = element.dictionary();
+      if (record == nullptr || elements.size() == 1) {
+        write(element);
+      } else {
+        places.clear();
+        places.reserve(record->size());
+        like(*record, before, placesBefore, places);
+        std::swap(places, placesBefore);
+      }
+      before = record;
+    }
+    stream_.Put(']');
+  }
+
+  // A dictionary that is probably like the one before it in the list, which may be none; it says where its entries are.
+  void like(const Dictionary& record, const Dictionary* before, const Places& placesBefore, Places& places) {
+    stream_.Put('{');
+    const size_t size = record.size();
+    const size_t sizeBefore = before != nullptr ? before->size() : 0;
+    size_t other = 0;  // the entry of the one before that is compared
+    for (size_t i = 0; i < size;) {
+      if (i != 0) stream_.Put(',');
+      // Behind more or fewer entries of the client's, the rest is alike again.
+      if (other < sizeBefore && !sameKey(record, i, *before, other) && sizeBefore + i >= size)
+        other = sizeBefore + i - size;
+      size_t same = 0;
+      while (i + same < size && other + same < sizeBefore &&
+             sameEntry(record, i + same, *before, other + same))
+        ++same;
+      if (same != 0) {
+        repeatEntries(placesBefore, other, same, places);
+      } else {
+        same = 1;
+        const size_t begin = stream_.position();
+        wholeEntry(record.begin()[i]);
+        places.push_back({begin, stream_.position()});
+      }
+      i += same;
+      other += same;
+    }
+    stream_.Put('}');
+  }
+
+  void repeatEntries(const Places& from, size_t first, size_t count, Places& places) {
+    const size_t begin = from[first].begin;
+    const size_t here = stream_.position();
+    stream_.repeat(begin, from[first + count - 1].end - begin);
+    for (size_t i = first; i < first + count; ++i)
+      places.push_back({from[i].begin - begin + here, from[i].end - begin + here});
+  }
+
+  // The same bits are the same text, number or block; others may be so too, and are written anew. Both dictionaries are
+  // alive, so no block of the one can be another's by now.
+  static bool sameKey(const Dictionary& a, size_t i, const Dictionary& b, size_t j) {
+    return std::memcmp(&a.begin()[i].key, &b.begin()[j].key, sizeof(kyt::String)) == 0;
+  }
+  static bool sameEntry(const Dictionary& a, size_t i, const Dictionary& b, size_t j) {
+    return std::memcmp(&a.begin()[i], &b.begin()[j], sizeof(DictionaryEntry)) == 0;
+  }
+
+  JSONTextStream stream_;
+};
+
 // The writer's record of open containers lives on the stack up to this depth.
 constexpr size_t kLevels = 64;
 using LevelAllocator = rapidjson::MemoryPoolAllocator<>;
-using CompactBase = rapidjson::Writer<JSONTextStream, rapidjson::UTF8<>, rapidjson::UTF8<>, LevelAllocator>;
 using PrettyBase =
     rapidjson::PrettyWriter<JSONTextStream, rapidjson::UTF8<>, rapidjson::UTF8<>, LevelAllocator>;
 
-// RapidJSON's writer for objects. Punctuation is its own; texts are copied by words, and doubles are the
-// shortest decimal in every case (RapidJSON's algorithm misses some).
-template <typename Base>
-class ObjectWriter : public Base {
+// RapidJSON's writer for objects. Punctuation is its own; texts are copied by words.
+class PrettyObjectWriter : public PrettyBase {
  public:
-  ObjectWriter(JSONTextStream& stream, LevelAllocator& allocator) : Base(stream, &allocator, kLevels) {}
+  PrettyObjectWriter(JSONTextStream& stream, LevelAllocator& allocator)
+      : PrettyBase(stream, &allocator, kLevels) {}
 
   void write(const Value& value) {
     switch (value.kind()) {
@@ -44,7 +183,7 @@ class ObjectWriter : public Base {
       case Value::Kind::unsignedInteger:
         return integer(*value.unsignedInteger());
       case Value::Kind::boolean:
-        this->Bool(*value.boolean());
+        Bool(*value.boolean());
         return;
       case Value::Kind::real:
         return real(*value.real());
@@ -55,77 +194,49 @@ class ObjectWriter : public Base {
       case Value::Kind::null:
       case Value::Kind::date:
       case Value::Kind::data:
-        this->Null();
+        Null();
         return;
     }
   }
 
  private:
-  void begin(rapidjson::Type type) {
-    if constexpr (std::is_same_v<Base, PrettyBase>) {
-      this->PrettyPrefix(type);
-    } else {
-      this->Prefix(type);
-    }
-  }
-
   void text(std::string_view view) {
-    begin(rapidjson::kStringType);
-    this->os_->appendQuoted(view);
-    this->EndValue(true);
+    PrettyPrefix(rapidjson::kStringType);
+    os_->appendQuoted(view);
+    EndValue(true);
   }
 
   void integer(auto number) {
-    begin(rapidjson::kNumberType);
-    char* to = this->os_->room(24);
-    if constexpr (std::is_signed_v<decltype(number)>) {
-      this->os_->advance(rapidjson::internal::i64toa(number, to));
-    } else {
-      this->os_->advance(rapidjson::internal::u64toa(number, to));
-    }
-    this->EndValue(true);
+    PrettyPrefix(rapidjson::kNumberType);
+    appendInteger(*os_, number);
+    EndValue(true);
   }
 
   void real(double number) {
     if (!std::isfinite(number)) {
-      this->Null();
+      Null();
       return;
     }
-    begin(rapidjson::kNumberType);
-    // Without an exponent where people would write none, as decimalText() does.
-    const double magnitude = std::fabs(number);
-    const bool plain = magnitude == 0 || (magnitude >= 1e-6 && magnitude < 1e17);
-    char* to = this->os_->room(64);
-    const auto result = plain ? std::to_chars(to, to + 64, number, std::chars_format::fixed)
-                              : std::to_chars(to, to + 64, number);
-    this->os_->advance(result.ptr);
-    this->EndValue(true);
+    PrettyPrefix(rapidjson::kNumberType);
+    appendReal(*os_, number);
+    EndValue(true);
   }
 
   void dictionary(const Dictionary& entries) {
-    this->StartObject();
+    StartObject();
     for (const DictionaryEntry& entry : entries) {
       text(entry.key.view());
       write(entry.value);
     }
-    this->EndObject();
+    EndObject();
   }
 
   void array(const Array& elements) {
-    this->StartArray();
+    StartArray();
     for (const Value& element : elements) write(element);
-    this->EndArray();
+    EndArray();
   }
 };
-
-template <typename Base>
-void writeObject(const Value& value, std::string& out) {
-  alignas(std::max_align_t) char levels[kLevels * 16 + 128];
-  LevelAllocator allocator(levels, sizeof levels);
-  JSONTextStream stream(out);
-  ObjectWriter<Base> writer(stream, allocator);
-  writer.write(value);
-}
 
 // Builds objects from the reader's events. Answering false ends the parse.
 class Builder {
@@ -220,11 +331,14 @@ Error errorAt(size_t offset, int code, const char* what) {
 }  // namespace
 
 void RapidJSON::writeCompact(const Value& value, std::string& out) {
-  writeObject<CompactBase>(value, out);
+  CompactWriter(out).write(value);
 }
 
 void RapidJSON::writePretty(const Value& value, std::string& out) {
-  writeObject<PrettyBase>(value, out);
+  alignas(std::max_align_t) char levels[kLevels * 16 + 128];
+  LevelAllocator allocator(levels, sizeof levels);
+  JSONTextStream stream(out);
+  PrettyObjectWriter(stream, allocator).write(value);
 }
 
 std::variant<Value, Error> RapidJSON::parse(std::string_view text) {

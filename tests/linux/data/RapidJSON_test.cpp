@@ -207,5 +207,38 @@ TEST(RapidJSON, LaysOutAsTheLayoutOfItsCompactText) {
   }
 }
 
+// Records as back ends make them: mostly the entries of the one before, among others that come and go.
+TEST(RapidJSON, WritesWhatRecordsHaveInCommonAsItWritesEachAlone) {
+  std::mt19937 random(6);
+  for (int round = 0; round < 300; ++round) {
+    Array records;
+    Dictionary record;
+    for (int i = 0; i < 12; ++i) {
+      for (size_t changes = random() % 4; changes != 0; --changes) {
+        const std::string key = "a key that has a block of its own " + std::to_string(random() % 20);
+        if (random() % 3 == 0)
+          record.remove(key);
+        else if (random() % 10 == 0)
+          record.set(key, std::string(random() % 9000, 'x'));
+        else
+          record.set(key, anything(random, 2));
+      }
+      if (random() % 4 == 0) record.set("k" + std::to_string(random() % 5), static_cast<int>(random() % 3));
+      records.append(random() % 15 == 0 ? anything(random, 3) : Value(record));
+    }
+    std::string alone = "[";
+    for (const Value& each : records) alone += (alone.size() > 1 ? "," : "") + compact(each);
+    ASSERT_EQ(compact(records), alone + "]");
+  }
+}
+
+TEST(RapidJSON, AppendsRecordsToWhatIsThere) {
+  const Dictionary record{{"a longer key than is kept inside", "a longer text than is kept inside"},
+                          {"k", 1}};
+  std::string out = "before ";
+  RapidJSON().writeCompact(Array{record, record, Dictionary(), record}, out);
+  EXPECT_EQ(out, "before [" + compact(record) + "," + compact(record) + ",{}," + compact(record) + "]");
+}
+
 }  // namespace
 }  // namespace kyt
