@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <functional>
 #include <memory>
+#include <random>
 #include <vector>
 
 #include "tests/integration/HierarchyFixture.h"
@@ -352,7 +353,10 @@ class SmallDevice : public AttackedDaemon {
   }
   static void uploading(const std::string& path) {
     const TemporaryFolder folder;
-    const std::string file = folder.write("large", std::string(3 << 20, 'x'));
+    std::string noise(3 << 20, 'x');  // that gzip cannot make small, so it is held until its answer
+    std::mt19937 random(7);
+    for (char& byte : noise) byte = static_cast<char>(random());
+    const std::string file = folder.write("large", noise);
     std::vector<std::unique_ptr<PlainUploader>> kept;
     for (int i = 0; i < 20; ++i) {
       kept.push_back(std::make_unique<PlainUploader>(path));
