@@ -1,9 +1,11 @@
 // How HTTPSPostBackend batches and flushes. What touches the batch runs on the state queue; messages are built and
 // completions run after it has been left.
+#include <optional>
 #include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "platform/Platform.h"
+#include "platform/base/Blocking.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
@@ -16,6 +18,10 @@
 namespace kyt {
 
 namespace {
+
+// Bytes of a batch, or of the message made of it, that take some ten milliseconds to write and compress: as long as a wait,
+// and no reason for other users' sessions to stand in line. Below, a worker more would cost more than it gives.
+constexpr size_t kTakesLong = 256u << 10;
 
 Error localError(const char* text) {
   return Error{kKYTReportingErrorDomain, -1, text};
@@ -148,6 +154,8 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
 }
 
 Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion completion, TextOf text) {
+  std::optional<BlockingScope> blocking;
+  if (bytes >= kTakesLong) blocking.emplace();
   const PostRequest post(configuration_, postFacts());
   const bool mayBeShown = post.mayBeShown();
   const bool mayGoBeside =
@@ -157,6 +165,7 @@ Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion
     return {};
   }
   PostRequest::Message message = makeMessage(post, std::move(records));
+  if (!blocking && message.json.size() >= kTakesLong) blocking.emplace();
   Value pretty;
   if (mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
     pretty = PostRequest::prettyText(message.json);
@@ -184,6 +193,8 @@ void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batc
   line_.add([post = std::move(*post), batch = std::move(batch), bytes]() mutable {
     const std::shared_ptr<UserAccount> account = post.reply.account;
     const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
+    std::optional<BlockingScope> blocking;
+    if (bytes >= kTakesLong) blocking.emplace();
     PostRequest::Message message = std::holds_alternative<Array>(batch)
                                        ? post.post.message(std::get<Array>(std::move(batch)))
                                        : std::get<PostRequest::Message>(std::move(batch));

@@ -6,7 +6,9 @@
 #include <thread>
 
 #include "platform/base/Mutex.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/backends/https/HTTPSFixture.h"
+#include "tests/support/Eventually.h"
 
 namespace kyt {
 namespace {
@@ -105,6 +107,36 @@ TEST_F(HTTPSPostBackendThreads, ARepliesThreadMayDropTheLastReference) {
     backend_.reset();
     reply.join();
     platform_.executor.runAll();
+  }
+}
+
+// With one worker that may run, another session's work does not wait for a batch of a megabyte.
+TEST_F(HTTPSPostBackendThreads, OthersRunWhileALargeBatchIsCompressed) {
+  for (const bool isLarge : {true, false}) {
+    std::atomic<bool> compressing{false}, otherRan{false}, othersRanMeanwhile{false}, flushed{false};
+    platform_.deflate.faults.beforeFinish = [&] {
+      compressing = true;
+      if (isLarge) othersRanMeanwhile = eventually([&] { return otherRan.load(); });
+      if (!isLarge) std::this_thread::yield();
+    };
+    entry_.set("event_threshold", 10000);
+    backend_ = nullptr;
+    decided();
+    for (int i = 0; i < 20; ++i) send(5, {{"text", std::string(isLarge ? 50000 : 50, 'x')}});
+    WorkerPoolOptions options;
+    options.runnable = 1;
+    WorkerPool pool(options);
+    const auto flushes = SerialQueue::create("flushes", pool), others = SerialQueue::create("others", pool);
+    flushes->async([&] {
+      backend().flushMessagesWithCompletion(nullptr);
+      flushed = true;
+    });
+    ASSERT_TRUE(eventually([&] { return compressing.load(); }));
+    others->async([&] { otherRan = true; });
+    EXPECT_TRUE(eventually([&] { return flushed.load() && otherRan.load(); }));
+    pool.shutDown();
+    EXPECT_EQ(othersRanMeanwhile, isLarge);
+    EXPECT_EQ(pool.figures().mostWorkers, isLarge ? 2U : 1U) << "a small batch is worth no further thread";
   }
 }
 
