@@ -40,9 +40,7 @@ std::string lineOf(double now, const char* format, std::initializer_list<Value> 
     if (const String* text = object.string()) length += text->size();
   std::string line;
   line.reserve(length);
-  line += '(';
-  line += description(Date{now});
-  line += ") ";
+  appendObjects(line, "(%@) ", {Date{now}});
   const size_t begin = line.size();
   appendObjects(line, format, objects);
   if (!isPlainLines(std::string_view(line).substr(begin))) {
