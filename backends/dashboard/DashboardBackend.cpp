@@ -4,6 +4,7 @@
 #include <array>
 #include <cstdio>
 #include <new>
+#include <string>
 #include <vector>
 
 #include "config/ClientTypes.h"
@@ -239,10 +240,10 @@ Value DashboardBackend::sendMessage(const Dictionary& message, const TimeValue& 
 
 String DashboardBackend::writeLocalLog(const DashboardDatagram& datagram) {
   const DashboardDatagram::Header header = datagram.header();
+  const std::string udid(header.udid);
   char line[1152];
-  std::snprintf(line, sizeof line, "%u.%03d %.*s 127.0.0.1 %s %5u %5u %5u %5u %5u %s",
-                static_cast<uint32_t>(header.time.seconds), header.time.microseconds / 1000,
-                static_cast<int>(header.udid.size()), header.udid.data(),
+  std::snprintf(line, sizeof line, "%u.%03d %s 127.0.0.1 %s %5u %5u %5u %5u %5u %s",
+                static_cast<uint32_t>(header.time.seconds), header.time.microseconds / 1000, udid.c_str(),
                 clientTypeShortCode(header.clientType), header.clientVersion, header.sessionID,
                 header.eventID, header.method, header.respCode, datagram.text());
   return line;
