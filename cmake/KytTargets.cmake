@@ -28,6 +28,29 @@ target_compile_options(kyt_options INTERFACE
 if(CMAKE_BUILD_TYPE STREQUAL "Release")
   target_compile_options(kyt_options INTERFACE -fstack-protector-strong -D_FORTIFY_SOURCE=2)
 endif()
+
+# Optimisation at link time is for the daemon, the client library and the benchmarks alone, since each program that has it
+# makes the machine code of all libraries anew. So their objects hold both kinds, and other programs are linked from the
+# machine code, with -fno-lto. A folder whose own objects no such program needs says set(KYT_LINK_TIME_OPTIMIZATION OFF).
+#
+# The archives' index must name what the machine code defines. With its plug-in ar lists the other kind's names, among
+# them inline functions of which no machine code is left; the linker then takes a member twice that it had already.
+# An explicit target keeps the plug-in out.
+define_property(TARGET PROPERTY KYT_LINK_TIME_OPTIMIZATION INITIALIZE_FROM_VARIABLE KYT_LINK_TIME_OPTIMIZATION)
+if(KYT_LINK_TIME_OPTIMIZATION)
+  if(NOT CMAKE_CXX_COMPILER_ID STREQUAL "GNU")
+    message(FATAL_ERROR "KYT_LINK_TIME_OPTIMIZATION needs GCC")
+  endif()
+  set(wanted $<BOOL:$<TARGET_PROPERTY:KYT_LINK_TIME_OPTIMIZATION>>)
+  target_compile_options(kyt_options INTERFACE "$<${wanted}:-flto=auto;-ffat-lto-objects>")
+  target_link_options(kyt_options INTERFACE "$<${wanted}:-flto=auto>" "$<$<NOT:${wanted}>:-fno-lto;-Wl,--gc-sections>")
+  execute_process(COMMAND ${CMAKE_LINKER} --print-output-format OUTPUT_VARIABLE format OUTPUT_STRIP_TRAILING_WHITESPACE
+    COMMAND_ERROR_IS_FATAL ANY)
+  set(CMAKE_CXX_ARCHIVE_CREATE "<CMAKE_AR> --target=${format} qcs <TARGET> <LINK_FLAGS> <OBJECTS>")
+  set(CMAKE_CXX_ARCHIVE_APPEND "<CMAKE_AR> --target=${format} qs <TARGET> <LINK_FLAGS> <OBJECTS>")
+  set(CMAKE_CXX_ARCHIVE_FINISH "")
+endif()
+
 if(KYT_SANITIZER)
   target_compile_options(kyt_options INTERFACE -fsanitize=${KYT_SANITIZER} -fno-sanitize-recover=all)
   target_link_options(kyt_options INTERFACE -fsanitize=${KYT_SANITIZER})
@@ -46,31 +69,49 @@ if(KYT_COVERAGE)
   target_link_options(kyt_options INTERFACE --coverage)
 endif()
 
-# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library.
+# kyt_precompiled_headers(NAME HEADERS ... [LINKS ...] [OPTIONS ...]): headers that are compiled once for all targets that
+# reuse them from NAME. No header of this project is among them, so a change of one never compiles them anew.
+function(kyt_precompiled_headers name)
+  cmake_parse_arguments(ARG "" "" "HEADERS;LINKS;OPTIONS" ${ARGN})
+  file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/${name}.cpp CONTENT "")
+  add_library(${name} OBJECT ${CMAKE_BINARY_DIR}/${name}.cpp)
+  target_link_libraries(${name} PRIVATE kyt_options ${ARG_LINKS})
+  target_compile_options(${name} PRIVATE ${ARG_OPTIONS})
+  if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")  # the compiler cache finds again what holds no time
+    target_compile_options(${name} PRIVATE "SHELL:-Xclang -fno-pch-timestamp")
+  endif()
+  target_precompile_headers(${name} PRIVATE ${ARG_HEADERS})
+endfunction()
+
+# kyt_library(NAME SOURCES ... LINKS ...): one folder's static library. In a build with optimisation at link time, which is
+# made whole more often than changed, the standard library's headers are compiled once; in the others, and in packages,
+# each file shows what it forgot to include.
 function(kyt_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;LINKS;PRIVATE_LINKS" ${ARGN})
   add_library(${name} STATIC ${ARG_SOURCES})
   target_link_libraries(${name} PUBLIC kyt_options ${ARG_LINKS} PRIVATE ${ARG_PRIVATE_LINKS})
+  if(KYT_LINK_TIME_OPTIMIZATION AND KYT_PRECOMPILED_HEADERS)
+    if(NOT TARGET kyt_headers)
+      kyt_precompiled_headers(kyt_headers HEADERS <algorithm> <array> <atomic> <chrono> <condition_variable> <functional>
+        <map> <memory> <mutex> <optional> <string> <string_view> <thread> <unordered_map> <utility> <variant> <vector>)
+    endif()
+    target_precompile_headers(${name} REUSE_FROM kyt_headers)
+  endif()
 endfunction()
 
 # What tests are compiled with: without optimisation, for nothing measures them, and with the headers of the test
-# framework and of the standard library compiled once. No header of this project is among those.
+# framework and of the standard library compiled once.
 function(kyt_test_options name)
   target_compile_options(${name} PRIVATE -O0 -U_FORTIFY_SOURCE)
   if(NOT KYT_PRECOMPILED_HEADERS)
     return()
   endif()
   if(NOT TARGET kyt_tests_headers)
-    file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/kyt_tests_headers.cpp CONTENT "")
-    add_library(kyt_tests_headers OBJECT ${CMAKE_BINARY_DIR}/kyt_tests_headers.cpp)
-    target_link_libraries(kyt_tests_headers PRIVATE kyt_options GTest::gtest)
-    target_compile_options(kyt_tests_headers PRIVATE -O0 -U_FORTIFY_SOURCE -fPIE)  # as programs are compiled
-    if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")  # the compiler cache finds again what holds no time
-      target_compile_options(kyt_tests_headers PRIVATE "SHELL:-Xclang -fno-pch-timestamp")
-    endif()
-    target_precompile_headers(kyt_tests_headers PRIVATE <gtest/gtest.h> <algorithm> <array> <atomic> <chrono>
-      <condition_variable> <filesystem> <fstream> <functional> <future> <map> <memory> <mutex> <optional> <set> <sstream>
-      <string> <string_view> <thread> <unordered_map> <utility> <variant> <vector>)
+    kyt_precompiled_headers(kyt_tests_headers LINKS GTest::gtest
+      OPTIONS -O0 -U_FORTIFY_SOURCE -fPIE  # as programs are compiled
+      HEADERS <gtest/gtest.h> <algorithm> <array> <atomic> <chrono> <condition_variable> <filesystem> <fstream>
+        <functional> <future> <map> <memory> <mutex> <optional> <set> <sstream> <string> <string_view> <thread>
+        <unordered_map> <utility> <variant> <vector>)
   endif()
   target_precompile_headers(${name} REUSE_FROM kyt_tests_headers)
 endfunction()

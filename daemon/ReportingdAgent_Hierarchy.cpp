@@ -19,8 +19,9 @@ namespace {
 constexpr size_t kMostShownOfAPath = 1024;  // bytes
 
 std::string shownPath(std::string_view path) {
-  if (path.size() <= kMostShownOfAPath) return std::string(path);
-  return std::string(path.substr(0, kMostShownOfAPath)) + " (cut)";
+  std::string shown(path.substr(0, kMostShownOfAPath));
+  if (path.size() > kMostShownOfAPath) shown += " (cut)";
+  return shown;
 }
 
 }  // namespace
