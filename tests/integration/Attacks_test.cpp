@@ -192,6 +192,13 @@ class AttackedDaemon : public HierarchyTest {
     for (const auto& each : std::filesystem::directory_iterator(folder)) count += each.exists() ? 1 : 1;
     return count;
   }
+  [[nodiscard]] size_t workers() const {
+    size_t count = 0;
+    const std::string folder = "/proc/" + std::to_string(stage_->daemon()->pid()) + "/task";
+    for (const auto& thread : std::filesystem::directory_iterator(folder))
+      if (contents(thread.path().string() + "/comm").starts_with("kyt-worker")) ++count;
+    return count;
+  }
   // At most twice what it was, and what the scheduler may take of a daemon that has work beside other tests.
   static void expectBearable(const Latency& before, const Latency& during) {
     EXPECT_LT(during.p99, 2 * before.p99 + (kSanitized ? 200 : 40));
@@ -462,6 +469,51 @@ TEST_F(AttackedDaemon, KeepsItsLogFromAClientThatFloodsIt) {
   EXPECT_GE(lines, 200u) << "the attack took place";
   EXPECT_LE(static_cast<double>(lines), 200 * (seconds + 2));
   expectBearable(before, during);
+  expectNothingLost();
+}
+
+// Sessions that configure while a storebag's server does not answer wait for the agent's monitor. Two users' would have
+// held all 512 workers.
+TEST_F(AttackedDaemon, KeepsItsWorkersFromClientsThatWaitForADownload) {
+  start("");
+  if (IsSkipped()) return;
+  ASSERT_FALSE(tools::writeFile(
+      stage_->folder() + "/etc/kytreportingd/entitlements.d/stranger.toml",
+      "[[grant]]\nuser = " + std::to_string(kStranger) + "\n\"com.vantu.private.kytreportingd\" = true\n",
+      0644));
+  ASSERT_TRUE(stage_->control("/control/reply", R"({"path":"/bags/tolvar/torvel","hang":true})"));
+  const Latency before = eventsOfTheVictim("alone");
+  const auto work = [](const std::string& path) {
+    static Connections kept;
+    if (!kept.empty()) ::pause();
+    raiseDescriptorLimit();
+    for (int i = 0; i < 400; ++i) {
+      kept.push_back(std::make_unique<PlainClient>(path));
+      if (!kept.back()->connected()) continue;
+      kept.back()->send(ClientHandshake::opening(::getuid()));
+      kept.back()->call(
+          "SetSessionInfo", "a{sv}aa{sv}avb",
+          [](MessageWriter& out) {
+            out.writeDictionary(Dictionary{{kKYTReportingSessionInfoSessionID, 77},
+                                           {kKYTReportingSessionInfoClientType, kTorvel}});
+            out.writeOptionalDictionary(std::nullopt);
+            out.writeOptionalValue(nullptr);
+            out.writeBoolean(false);
+          },
+          false);
+      kept.back()->call("StartConfigWithCompletionHandler");
+    }
+  };
+  const Attacker one(socket(), work), other(socket(), work, kStranger);
+  EXPECT_TRUE(eventually([&] { return workers() > 150; })) << workers();
+  const Latency during = eventsOfTheVictim("attacked");
+  const size_t most = workers();
+  std::printf("the daemon: %zu workers\n", most);
+  EXPECT_LT(most, 220u)
+      << "a fifth of all for the first user, of the rest for the second, and those that run";
+  EXPECT_TRUE(one.isDone(std::chrono::seconds(10)) && other.isDone(std::chrono::seconds(10)));
+  // Eight hundred clients that come at once are felt; a download would be for 15 s.
+  EXPECT_LT(during.p99, 2 * before.p99 + 2000);
   expectNothingLost();
 }
 
