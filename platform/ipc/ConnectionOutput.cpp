@@ -16,7 +16,7 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return Sent::closed;
-    std::string& queue = open_ ? pending_ : early_;
+    std::string& queue = open_ ? pending_.end() : early_;
     const size_t before = queue.size();
     if (++lastSerial_ == 0) ++lastSerial_;
     MessageWriter writer(queue);
@@ -39,7 +39,7 @@ void ConnectionOutput::sendHandshake(std::string_view bytes) {
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return;
-    pending_.append(bytes);
+    pending_.end().append(bytes);
     news = queued();
   }
   tell(news);
@@ -51,7 +51,7 @@ void ConnectionOutput::open() {
     MutexLock lock(mutex_);
     open_ = true;
     if (stream_ == nullptr || dead_ || early_.empty()) return;
-    pending_.append(std::exchange(early_, std::string()));
+    pending_.end().append(std::exchange(early_, std::string()));
     news = queued();
   }
   tell(news);
@@ -80,20 +80,16 @@ void ConnectionOutput::countWaiting() {
 // Nothing is sent any more.
 void ConnectionOutput::discard() {
   dead_ = true;
-  pending_ = std::string();
-  written_ = 0;
+  pending_.clear();
   charge_.clear();
 }
 
 ConnectionOutput::News ConnectionOutput::flush() {
-  while (written_ < pending_.size()) {
-    const StreamResult result = stream_->write(std::string_view(pending_).substr(written_));
+  const bool hadAny = !pending_.empty();
+  while (!pending_.empty()) {
+    const StreamResult result = stream_->write(pending_.front());
     if (result.status == StreamStatus::wouldBlock) {
-      if (written_ > pending_.size() / 2) {
-        pending_.erase(0, written_);
-        written_ = 0;
-      }
-      const bool mayGoOn = paused_ && pending_.size() - written_ <= maxQueuedBytes_ / 2;
+      const bool mayGoOn = paused_ && pending_.size() <= maxQueuedBytes_ / 2;
       if (mayGoOn) paused_ = false;
       waiting_ = true;
       countWaiting();
@@ -103,10 +99,9 @@ ConnectionOutput::News ConnectionOutput::flush() {
       discard();
       return {.broken = true};
     }
-    written_ += result.bytes;
+    pending_.remove(result.bytes);
   }
-  pending_ = std::string();  // an idle connection holds no buffer
-  written_ = 0;
+  if (hadAny) pending_.clear();  // an idle connection holds no buffer
   const bool tellDrained = paused_.exchange(false) || (finishing_ && waiting_);
   waiting_ = false;
   countWaiting();

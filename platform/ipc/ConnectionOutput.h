@@ -18,6 +18,7 @@
 #include "platform/base/Mutex.h"
 #include "platform/base/UserBudget.h"
 #include "platform/ipc/MessageWriter.h"
+#include "platform/ipc/OutgoingBytes.h"
 
 namespace kyt {
 
@@ -84,9 +85,7 @@ class ConnectionOutput {
   };
   News flush() REQUIRES(mutex_);
   News queued(Kind kind = Kind::ordinary) REQUIRES(mutex_);
-  [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) {
-    return pending_.size() - written_ + early_.size();
-  }
+  [[nodiscard]] size_t waitingBytes() const REQUIRES(mutex_) { return pending_.size() + early_.size(); }
   void countWaiting() REQUIRES(mutex_);
   [[nodiscard]] bool fillsItsUsersShare() const REQUIRES(mutex_) {
     return waiting_ && account_ != nullptr && account_->isOver(Share::bytes);
@@ -100,10 +99,9 @@ class ConnectionOutput {
   const uint64_t maxQueuedBytes_;
   const std::shared_ptr<UserAccount> account_;
   Charge charge_ GUARDED_BY(mutex_);  // for what waits while the socket is full, its own buffer included
-  std::string pending_ GUARDED_BY(mutex_);
+  OutgoingBytes pending_ GUARDED_BY(mutex_);
   std::string early_ GUARDED_BY(mutex_);  // messages that wait for the handshake's end
   bool open_ GUARDED_BY(mutex_) = false;
-  size_t written_ GUARDED_BY(mutex_) = 0;  // of pending_
   uint32_t lastSerial_ GUARDED_BY(mutex_) = 0;
   bool held_ GUARDED_BY(mutex_) = false;
   bool waiting_ GUARDED_BY(mutex_) = false;  // for room
