@@ -64,6 +64,30 @@ void KYTReportingBackend::setReportingSessionConnectivityDelegate(
   reportingSessionConnectivityDelegate_ = std::move(delegate);
 }
 
+void KYTReportingBackend::setProgram(std::shared_ptr<const ReportingProgram> program) {
+  if (tally_ != nullptr) drainStateQueue();
+  tally_ = nullptr;
+  tallies_ = {};
+  program_ = std::move(program);
+}
+
+void KYTReportingBackend::takeEvent(bool isInternal) {
+  std::shared_ptr<Tally>& tally = tallies_[isInternal ? 1 : 0];
+  if (tally == nullptr && program_ != nullptr)
+    tally = platform_.books.open(*program_, name_.view(), isInternal);
+  tally_ = tally.get();
+  if (tally_ != nullptr) tally_->take();
+}
+
+void KYTReportingBackend::dropEvent(Tally* tally, Reason fate) const {
+  platform_.counters.add(fate);
+  if (tally != nullptr) tally->drop(fate, 1);
+}
+
+void KYTReportingBackend::eventDelivered() const {
+  if (tally_ != nullptr) tally_->deliver(1);
+}
+
 int32_t KYTReportingBackend::state() const {
   return stateQueue_->sync([this] {
     stateQueue_->assertCurrent();
@@ -84,7 +108,7 @@ void KYTReportingBackend::updateState() {
 
 Value KYTReportingBackend::sendMessage(Dictionary, const TimeValue&, uint16_t, uint16_t, EventID,
                                        MessageFlag) {
-  platform_.counters.add(Reason::notForThisBackEnd);
+  dropEvent(Reason::notForThisBackEnd);
   return {};
 }
 

@@ -12,6 +12,7 @@
 // Its operations and properties are a contract with the sessions, so it has more than other classes.
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -23,6 +24,7 @@
 #include "backend/SessionFacts.h"
 #include "backend/SessionIDPath.h"
 #include "platform/FileExtension.h"
+#include "platform/base/Books.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Error.h"
 #include "platform/base/Function.h"
@@ -94,6 +96,13 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   void setAnswerReader(AnswerReader* reader) { answerReader_ = reader; }
   void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> delegate);
 
+  // The books. Whose events come next; null, as at first: they are counted, and not booked.
+  void setProgram(std::shared_ptr<const ReportingProgram> program);
+  // Before each event, whatever becomes of it. `isInternal`: a message of the daemon's own.
+  void takeEvent(bool isInternal);
+  // The event that was taken last.
+  void dropEvent(Reason fate) const { dropEvent(tally_, fate); }
+
   // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
   // before it.
   [[nodiscard]] int32_t state() const;
@@ -156,6 +165,11 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] bool isAnswerWanted(size_t leastBytes) const {
     return answerReader_ == nullptr || answerReader_->wantsAnswer(leastBytes);
   }
+  // The books' side of the event that was taken last; null: it is not booked. It lives until the next setProgram(), which
+  // waits for what stands on the state queue.
+  [[nodiscard]] Tally* tally() const { return tally_; }
+  void dropEvent(Tally* tally, Reason fate) const;
+  void eventDelivered() const;
   // Of the latest event.
   [[nodiscard]] uint16_t eventNumber() const { return eventID_; }
   void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }
@@ -192,6 +206,10 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   int32_t digestAlgorithm_ = 0;
   std::shared_ptr<UserAccount> userAccount_;
   AnswerReader* answerReader_ = nullptr;
+  std::shared_ptr<const ReportingProgram> program_;
+  std::array<std::shared_ptr<Tally>, 2>
+      tallies_;             // its events, and the daemon's own; opened by the first of each
+  Tally* tally_ = nullptr;  // one of them
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
 
   int32_t state_ GUARDED_BY(*stateQueue_) = kBackendStateUndecided;

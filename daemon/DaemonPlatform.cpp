@@ -91,6 +91,7 @@ DaemonPlatform::DaemonPlatform(Start start)
           .pluginBundles = pluginBundles,
           .powerLog = powerLog,
           .budget = budget,
+          .books = books,
       } {}
 
 }  // namespace kyt

@@ -11,6 +11,7 @@
 
 #include "platform/Deflate.h"
 #include "platform/Platform.h"
+#include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Paths.h"
 #include "platform/base/Settings.h"
@@ -57,6 +58,7 @@ struct DaemonPlatform {
   DaemonPlatform& operator=(const DaemonPlatform&) = delete;
 
   UserBudget budget;
+  Books books;
   LinuxClock clock;
   const std::unique_ptr<EpollReactor> reactor;
   WorkerPool workers;

@@ -183,6 +183,9 @@ void DaemonServices::logFigures() {
       log_.normal("shutDown: %s: %llu", reasonName(reason),
                   static_cast<unsigned long long>(counters_.value(reason)));
   }
+  if (!log_.debugEnabled()) return;
+  for (const BookRow& row : system_.books.snapshot())
+    log_.debug("shutDown: books: %s", describeRow(row).c_str());
 }
 
 }  // namespace kyt

@@ -4,6 +4,7 @@
 
 namespace kyt {
 
+class Books;
 class Bundle;
 class Clock;
 class Counters;
@@ -53,6 +54,7 @@ struct Platform {
   PluginBundles& pluginBundles;
   PowerLog& powerLog;
   UserBudget& budget;
+  Books& books;
 };
 
 }  // namespace kyt

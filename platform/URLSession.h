@@ -26,6 +26,7 @@
 
 namespace kyt {
 
+class BookedEvents;
 class UserAccount;
 
 // The domain of transport failures; the code is libcurl's (CURLcode), or one of those below.
@@ -49,6 +50,7 @@ struct URLRequest {
   // What the server can tell from the request anyway about who sends it: requests of one identity may let it see that they
   // come from the same device, those of two never, unless they go through one URL session. Empty: none.
   std::string identity;
+  std::shared_ptr<const BookedEvents> events;  // what is told when it begins and ceases to wait; null: nobody
 };
 
 struct URLResponse {

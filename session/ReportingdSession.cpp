@@ -17,6 +17,7 @@
 #include "platform/objects/ObjectSize.h"
 #include "platform/queues/Log.h"
 #include "session/ReportingSessionConnectivityHelper.h"
+#include "session/ReportingdSessionClass.h"
 #include "session/SessionInfoCheck.h"
 
 namespace kyt {
@@ -99,6 +100,7 @@ void ReportingdSession::takeOverIdentity(const Dictionary& sessionInfo) {
   clientType_.store(sessionInfo.integer(kKYTReportingSessionInfoClientType), std::memory_order_relaxed);
   figuresMayHaveChanged();
   _sessionDelegate.updateCorrelatedSessions(*this);
+  identifyProgram();
 }
 
 void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
@@ -110,10 +112,20 @@ void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dic
   takeOverIdentity(sessionInfo);
   _frameworks = std::move(frameworksToCheck);
   _userInfo = std::move(userInfo);
+  identifyProgram();
   countInformation();
   std::optional<MonitorLock> lock;
   if (wasInHierarchy_) lock.emplace(_sessionDelegate.monitor());
   setHasAggregator(hasAggregationBlock);
+}
+
+// What the books know of the session. Events that came before belong to the program that it was then.
+void ReportingdSession::identifyProgram() {
+  ReportingProgram program = programOf(peerUser_, clientType(), _userInfo);
+  if (program_ != nullptr && *program_ == program) return;
+  program_ = std::make_shared<const ReportingProgram>(std::move(program));
+  withoutBackend_ = {};
+  for (const auto& [key, backend] : _backends) backend->setProgram(program_);
 }
 
 // Little of it counts with the connection. A client whose user has no room for it goes.
@@ -154,6 +166,7 @@ void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
   for (const auto& [key, backend] : backends) {
     backend->setUserAccount(userAccount_);
     backend->setAnswerReader(this);
+    backend->setProgram(program_);
     backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
     backend->setCombinedSessionIDString(_sessionIDString);
   }
@@ -216,6 +229,7 @@ void ReportingdSession::receivedUserInfo(const std::optional<Dictionary>& userIn
     return;
   }
   _userInfo = userInfo;
+  identifyProgram();
   countInformation();
   updateUserInfoForBackends();
   if (!changed) return;

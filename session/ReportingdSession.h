@@ -24,6 +24,7 @@
 
 #include "backend/BackendFactory.h"
 #include "config/DeviceIdentity.h"
+#include "platform/base/Books.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/UserBudget.h"
@@ -122,6 +123,7 @@ class ReportingdSession final : public ClientSessionInterface,
   void takeOverIdentity(const Dictionary& sessionInfo);
   void figuresMayHaveChanged();
   void countInformation();
+  void identifyProgram();
   void createBackendsWithStorebag(const Dictionary& storebag);
   void updateSessionWithDefaultSessionInfo();
   void sendStartMessage();
@@ -136,6 +138,8 @@ class ReportingdSession final : public ClientSessionInterface,
   void internalSendMessage(std::optional<Dictionary> payload, const TimeValue& timestamp, uint16_t method,
                            uint16_t respCode);
   [[nodiscard]] Dictionary envelopeWithPayload(std::optional<Dictionary> payload);
+  // An event that no back end gets.
+  void dropEvent(Reason fate);
   // At the default level, once for a reason in the session's life, and once a minute for its user and client type.
   void tellDrop(Reason reason, const std::string& why);
   void tellFiltered(const KYTReportingBackend& backend, uint16_t category);
@@ -190,6 +194,10 @@ class ReportingdSession final : public ClientSessionInterface,
   std::bitset<static_cast<size_t>(Reason::numberOfReasons)> toldDrops_;
   bool toldOddNumbers_ = false;
   bool isAnswerAwaited_ = false;  // of the call that is being served
+  // The books: whose events these are, and those that no back end got, as KYTReportingBackend keeps them.
+  std::shared_ptr<const ReportingProgram> program_;
+  std::array<std::shared_ptr<Tally>, 2> withoutBackend_;
+  bool sendsInternalMessage_ = false;
   bool _hasFinishedGracefully = false;
   std::optional<Data> _digestKey;
   const int32_t _digestAlgorithm = 0;  // never assigned, deliberately: see setDigestKey()

@@ -27,6 +27,15 @@ class MessageLogReader final : public AnswerReader {
 
 }  // namespace
 
+ReportingProgram programOf(uint32_t user, int32_t clientType, const std::optional<Dictionary>& userInfo) {
+  const auto name = [&userInfo](const char* key) {
+    const Value* value = userInfo ? userInfo->find(key) : nullptr;
+    const String* text = value != nullptr ? value->string() : nullptr;
+    return text != nullptr ? text->str() : std::string();
+  };
+  return {user, clientType, name(kKYTReportingUserInfoClientName), name(kKYTReportingUserInfoServiceName)};
+}
+
 ReportingdSessionClass::ReportingdSessionClass(Configuration configuration, BackendFactory& backendFactory,
                                                MessageLog& messageLog)
     : configuration_(configuration), backendFactory_(backendFactory), messageLog_(messageLog) {}
@@ -40,9 +49,16 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::sing
   return singleMessageHelper_;
 }
 
+void ReportingdSessionClass::dropEvent(const ReportingProgram& program, Reason fate) const {
+  platform().counters.add(fate);
+  const std::shared_ptr<Tally> tally = platform().books.open(program, kNoBackEnd, false);
+  tally->take();
+  tally->drop(fate, 1);
+}
+
 void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, uint16_t category) const {
   const std::string name = backend.name().str();
-  platform().counters.add(Reason::eventFiltered);
+  backend.dropEvent(Reason::eventFiltered);
   if (platform().counters.mayTell(Reason::eventFiltered, name + std::to_string(category),
                                   platform().clock.monotonic()))
     platform().log.normal(
@@ -61,10 +77,13 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
   const Value* sessionID = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoSessionID) : nullptr;
   log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %ld",
             static_cast<long>(sessionID != nullptr ? sessionID->longLongValue() : 0));
+  const Value* clientType = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoClientType) : nullptr;
+  const auto program = std::make_shared<const ReportingProgram>(
+      programOf(user, clientType != nullptr ? clientType->intValue() : 0, userInfo));
   if (!sessionInfo || !storebag) {
     // The leading "R" is part of the message that tools look for.
     log.error("RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters");
-    platform().counters.add(storebag ? Reason::identifiersMissing : Reason::noStorebag);
+    dropEvent(*program, storebag ? Reason::identifiersMissing : Reason::noStorebag);
     return;
   }
   char deviceID[kDeviceIDSize] = {};
@@ -74,7 +93,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
       backendFactory_.createBackends(storebag, sessionInfo, userInfo, deviceID);
   if (!backends || backends->empty()) {
     log.error("sendMessageWithSessionInfo: No backends available to send single message");
-    platform().counters.add(Reason::noBackEnds);
+    dropEvent(*program, Reason::noBackEnds);
     return;
   }
   if (userInfo && !sessionInfo->boolean(kKYTReportingSessionInfoRequireUserInfo))
@@ -85,6 +104,8 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
   for (const auto& [key, backend] : *backends) {
     backend->setUserAccount(account);
     backend->setAnswerReader(&reader);
+    backend->setProgram(program);
+    backend->takeEvent(false);
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
     if (!backend->isWhitelistedEvent(category)) {

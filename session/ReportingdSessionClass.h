@@ -11,10 +11,15 @@
 #include <optional>
 
 #include "config/Configuration.h"
+#include "platform/base/Books.h"
 #include "platform/base/Mutex.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
+
+// The books' name of a session's program: its user, its client type and the names in its user information.
+[[nodiscard]] ReportingProgram programOf(uint32_t user, int32_t clientType,
+                                         const std::optional<Dictionary>& userInfo);
 
 class BackendFactory;
 class KYTReportingBackend;
@@ -48,6 +53,7 @@ class ReportingdSessionClass {
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> singleMessageHelper();
 
  private:
+  void dropEvent(const ReportingProgram& program, Reason fate) const;
   void tellFiltered(const KYTReportingBackend& backend, uint16_t category) const;
   Configuration configuration_;
   BackendFactory& backendFactory_;

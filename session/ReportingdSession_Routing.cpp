@@ -46,6 +46,15 @@ int32_t clientTypeIn(const std::optional<Dictionary>& sessionInfo) {
 
 }  // namespace
 
+void ReportingdSession::dropEvent(Reason fate) {
+  std::shared_ptr<Tally>& tally = withoutBackend_[sendsInternalMessage_ ? 1 : 0];
+  if (program_ == nullptr) identifyProgram();
+  if (tally == nullptr) tally = platform().books.open(*program_, kNoBackEnd, sendsInternalMessage_);
+  counters().add(fate);
+  tally->take();
+  tally->drop(fate, 1);
+}
+
 void ReportingdSession::tellDrop(Reason reason, const std::string& why) {
   const auto bit = static_cast<size_t>(reason);
   if (toldDrops_.test(bit)) return;
@@ -73,21 +82,21 @@ void ReportingdSession::tellOddNumbers(const Value& category, const Value& type)
 Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!hasBackends()) {
     log().debug("sendMessageWithDictionary: No backends available to send message");
-    counters().add(withoutBackends_);
+    dropEvent(withoutBackends_);
     tellDrop(withoutBackends_, whyWithoutBackends(withoutBackends_));
     return nullptr;
   }
   const Value* category = message.find(kKYTReportingMessageParametersCategory);
   if (category == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
-    counters().add(Reason::categoryOrTypeMissing);
+    dropEvent(Reason::categoryOrTypeMissing);
     tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
   const Value* type = message.find(kKYTReportingMessageParametersType);
   if (type == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
-    counters().add(Reason::categoryOrTypeMissing);
+    dropEvent(Reason::categoryOrTypeMissing);
     tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
@@ -133,11 +142,12 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
   size_t left = _backends.size();
   for (const auto& [key, backend] : _backends) {
     --left;
+    backend->takeEvent(sendsInternalMessage_);
     if (!backend->isWhitelistedEvent(category)) {
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
           category, backend->name().c_str());
-      counters().add(Reason::eventFiltered);
+      backend->dropEvent(Reason::eventFiltered);
       tellFiltered(*backend, category);
       continue;
     }
@@ -145,7 +155,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is blacklisted for backend %s",
           category, backend->name().c_str());
-      counters().add(Reason::eventFiltered);
+      backend->dropEvent(Reason::eventFiltered);
       tellFiltered(*backend, category);
       continue;
     }
@@ -170,7 +180,9 @@ void ReportingdSession::internalSendMessage(std::optional<Dictionary> payload, c
   if (payload) message.set(kKYTReportingMessageParametersPayload, std::move(*payload));
   message.set(kKYTReportingMessageParametersFlag, 0U);
   // Nobody waits for the answer of an internal message.
+  sendsInternalMessage_ = true;
   static_cast<void>(sendMessageWithDictionaryError(std::move(message)));
+  sendsInternalMessage_ = false;
   log().debug("internalSendMessage: Sent internal message (method:%d respCode:%d)", method, respCode);
 }
 
@@ -180,7 +192,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   if (!sessionInfo.contains(kKYTReportingSessionInfoClientType) ||
       !sessionInfo.contains(kKYTReportingSessionInfoSessionID)) {
     log().error("sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo");
-    counters().add(Reason::identifiersMissing);
+    dropEvent(Reason::identifiersMissing);
     if (reply) reply("Could not retrieve identifiers from sessionInfo");
     return;
   }
@@ -189,7 +201,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   log().debug("sendMessageWithSessionInfo: Sending message with session info for session %u", _sessionID);
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
   if (!storebag) {
-    counters().add(Reason::noStorebag);
+    dropEvent(Reason::noStorebag);
     tellDrop(Reason::noStorebag, whyWithoutBackends(Reason::noStorebag));
     if (reply) reply("storebag not available");
     return;

@@ -26,10 +26,12 @@ void EventBatch::sessionIDChanged() {
 }
 
 void EventBatch::append(Dictionary record, int32_t method, int32_t count, uint64_t bytes,
-                        const std::optional<SessionIDPath>& sessionID) {
+                        const std::optional<SessionIDPath>& sessionID, Tally* tally) {
   writeSessionID(sessionID);  // the new record has its own
   begin();
   records_->append(std::move(record));
+  events_.add(tally);
+  if (tally != nullptr) tally->enterBatch();
   bytes_ += bytes;
   const auto place = std::lower_bound(counts_.begin(), counts_.end(), std::pair<int32_t, int32_t>{method, 0});
   if (place != counts_.end() && place->first == method) {
@@ -45,6 +47,8 @@ EventBatch::Taken EventBatch::take(const std::optional<SessionIDPath>& sessionID
   if (records_) taken.records = std::move(*records_);
   records_.reset();
   counts_.clear();
+  taken.events = std::exchange(events_, {});
+  taken.events.leaveBatch();
   taken.bytes = std::exchange(bytes_, 0);
   forgetSizes();
   return taken;

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "backend/SessionIDPath.h"
+#include "platform/base/Books.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
@@ -19,7 +20,8 @@ class EventBatch {
  public:
   struct Taken {
     Array records;
-    uint64_t bytes = 0;  // as they were given to append()
+    BookedEvents events;  // the same, for the books
+    uint64_t bytes = 0;   // as they were given to append()
   };
 
   // A batch exists from the first event that is to be batched until it is taken: a flush tells an empty one from none.
@@ -34,8 +36,9 @@ class EventBatch {
   // Whoever joins a hierarchy changes the identifiers of all sessions beneath, and holds the agent's monitor meanwhile:
   // so the records get the new one only when somebody reads or adds to them. These functions take the current one.
   void sessionIDChanged();
+  // `tally`: in which the event is booked; null: in none.
   void append(Dictionary record, int32_t method, int32_t count, uint64_t bytes,
-              const std::optional<SessionIDPath>& sessionID);
+              const std::optional<SessionIDPath>& sessionID, Tally* tally = nullptr);
   [[nodiscard]] Taken take(const std::optional<SessionIDPath>& sessionID);
   // By the health report's estimate. The ends of other sessions ask too, so records that were sized before are not
   // sized again.
@@ -47,6 +50,7 @@ class EventBatch {
 
   std::optional<Array> records_;
   std::vector<std::pair<int32_t, int32_t>> counts_;  // method, records of it; sorted
+  BookedEvents events_;
   uint64_t bytes_ = 0;
   bool hasOldSessionID_ = false;
   size_t sizedRecords_ = 0;  // so many at the beginning have been sized

@@ -89,13 +89,15 @@ void HTTPSPostBackend::cleanup() {
 HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
-  giveBackToUser(batch_.bytes());
   if (!batch_.exists()) return;
-  platform().counters.add(Reason::batchDiscarded, batch_.size());
-  tellDiscarded(batch_.size(), lacksUserInfo() ? "user information was promised and is missing"
-                               : stateOnQueue() == kBackendStateEnabled
-                                   ? "a single message was batched, since its client entry has \"expedite\" 0"
-                                   : "the back end was not enabled");
+  const EventBatch::Taken batch = batch_.take(combinedSessionIDOnQueue());
+  giveBackToUser(batch.bytes);
+  batch.events.drop(platform().counters, Reason::batchDiscarded);
+  tellDiscarded(batch.records.size(),
+                lacksUserInfo() ? "user information was promised and is missing"
+                : stateOnQueue() == kBackendStateEnabled
+                    ? "a single message was batched, since its client entry has \"expedite\" 0"
+                    : "the back end was not enabled");
 }
 
 HTTPSPostBackend::Device HTTPSPostBackend::readDevice() {
@@ -168,7 +170,7 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
   });
   const int32_t oldState = now.state;
   if (oldState == kBackendStateDisabled) {
-    platform().counters.add(Reason::eventDroppedByState);
+    dropEvent(Reason::eventDroppedByState);
     return {};
   }
   Dictionary payload = records_.takePayload(message);
@@ -220,8 +222,18 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
       text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
   }
   if (before != nullptr) immutable_ = true;
-  postJSONMessage(std::move(message.json), flag, method, respCode, nullptr, message.events);
+  BookedEvents event;
+  event.add(tally());
+  postJSONMessage(std::move(message.json), flag, method, respCode, nullptr,
+                  carried(std::move(event), message.events));
   return text;
+}
+
+// Without a client ID a message carries none of its events.
+BookedEvents HTTPSPostBackend::carried(BookedEvents events, size_t inMessage) const {
+  if (inMessage != 0) return events;
+  events.drop(platform().counters, Reason::postWithoutClientID);
+  return {};
 }
 
 PostFacts HTTPSPostBackend::postFacts() const {
@@ -265,29 +277,35 @@ std::optional<std::string> HTTPSPostBackend::createMessageForPostAndLogging(Arra
 
 void HTTPSPostBackend::postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
                                        std::optional<uint16_t> responseCode, FlushCompletion completion,
-                                       size_t events) {
+                                       BookedEvents events) {
   line_.finish();  // what was posted before leaves before
-  std::optional<OutgoingPost> post = newPost(flag, method, responseCode, std::move(completion), events);
+  std::optional<OutgoingPost> post =
+      newPost(flag, method, responseCode, std::move(completion), std::move(events));
   if (post) std::move(*post).send(std::move(json));
 }
 
 std::optional<OutgoingPost> HTTPSPostBackend::newPost(MessageFlag flag, std::optional<uint16_t> method,
                                                       std::optional<uint16_t> responseCode,
-                                                      FlushCompletion completion, size_t events) {
+                                                      FlushCompletion completion, BookedEvents events) {
   const std::optional<String>& url = isRealtime(flag) ? decision_.realtimePostURL : decision_.postURL;
   if (!url) {
-    platform().counters.add(Reason::postWithoutURL, events);
+    events.drop(platform().counters, Reason::postWithoutURL);
     if (platform().counters.mayTell(Reason::postWithoutURL, name().str() + std::to_string(facts().compType),
                                     platform().clock.monotonic()))
       platform().log.normal(
           "HTTPSPostBackend(postJsonMessage): The storebag's %s has no post_url for client type %d: %zu events are lost",
-          name().c_str(), facts().compType, events);
+          name().c_str(), facts().compType, events.size());
     if (completion) completion(Value(), Error{kKYTReportingErrorDomain, -1, "postURL is nil"});
     return std::nullopt;
   }
-  OutgoingPost post{
-      PostRequest(configuration_, postFacts()), *url, std::nullopt, connectivityDelegate(),
-      PostReply{weak_from_this(), platform(), name(), std::move(completion), events, {}, userAccount()}};
+  OutgoingPost post{PostRequest(configuration_, postFacts()), *url, std::nullopt, connectivityDelegate(),
+                    PostReply{weak_from_this(),
+                              platform(),
+                              name(),
+                              std::move(completion),
+                              PostedEvents(std::move(events), platform().counters),
+                              {},
+                              userAccount()}};
   if (method && responseCode) post.eventMap = EventMap{*method, *responseCode};
   return post;
 }

@@ -87,9 +87,10 @@ class HTTPSPostBackend : public KYTReportingBackend {
                                                                           Value* prettyJSONString,
                                                                           size_t* events = nullptr);
   // The completion gets (nothing, error or nothing); it is never called without a connectivity delegate.
-  // `events` is how many are lost with the message.
+  // `events` are those that are lost with the message.
   void postJSONMessage(std::string json, MessageFlag flag, std::optional<uint16_t> method,
-                       std::optional<uint16_t> responseCode, FlushCompletion completion, size_t events = 1);
+                       std::optional<uint16_t> responseCode, FlushCompletion completion,
+                       BookedEvents events = BookedEvents::unbooked(1));
 
   [[nodiscard]] const std::optional<String>& postURL() const { return decision_.postURL; }
   void setPostURL(std::optional<String> value) { decision_.postURL = std::move(value); }
@@ -117,7 +118,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   // None without an address, which the completion has been told.
   [[nodiscard]] std::optional<OutgoingPost> newPost(MessageFlag flag, std::optional<uint16_t> method,
                                                     std::optional<uint16_t> responseCode,
-                                                    FlushCompletion completion, size_t events);
+                                                    FlushCompletion completion, BookedEvents events);
   Value sendStandalone(Dictionary record, int32_t state, uint16_t method, uint16_t respCode,
                        MessageFlag flag);
 
@@ -125,16 +126,17 @@ class HTTPSPostBackend : public KYTReportingBackend {
   // The text of the flush alone is made where somebody wants it, that of one that goes before an event always.
   Value flush(FlushCompletion completion, TextOf text);
   // `bytes` are what the records count with the user.
-  Value postBatch(Array records, uint64_t bytes, FlushCompletion completion, TextOf text);
-  void postBeside(std::variant<Array, PostRequest::Message> batch, uint64_t bytes);
-  [[nodiscard]] bool hasRoomFor(uint64_t batched, uint64_t bytes) const;
+  Value postBatch(EventBatch::Taken batch, uint64_t bytes, FlushCompletion completion, TextOf text);
+  void postBeside(std::variant<Array, PostRequest::Message> batch, BookedEvents events, uint64_t bytes);
+  [[nodiscard]] bool takesRoomFor(uint64_t batched, uint64_t bytes);
   void giveBackToUser(uint64_t bytes) const;
-  void countDroppedByLimit() const;
-  void countDroppedByUser() const;
+  void tellDroppedByLimit() const;
+  void tellDroppedByUser() const;
   [[nodiscard]] BatchTaking takeBatchOnQueue(EventBatch::Taken& batch) REQUIRES(stateQueue());
   void tellDiscarded(size_t events, const char* why) const;
   [[nodiscard]] bool admits(const Dictionary& record) const;
-  [[nodiscard]] Array recordsToPost(EventBatch::Taken batch) const;
+  [[nodiscard]] EventBatch::Taken recordsToPost(EventBatch::Taken batch) const;
+  [[nodiscard]] BookedEvents carried(BookedEvents events, size_t inMessage) const;
 
   [[nodiscard]] PostFacts postFacts() const;
 

@@ -55,7 +55,7 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
     });
   }
   const uint64_t bytes = roughSize(record);
-  if (!hasRoomFor(batched, bytes)) {
+  if (!takesRoomFor(batched, bytes)) {
     // What was dropped must not leave an empty batch behind: a flush would say that it was filtered out.
     stateQueue().async([this] {
       stateQueue().assertCurrent();
@@ -63,21 +63,23 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
     });
     return flushed;
   }
-  stateQueue().async([this, record = std::move(record), method, count, bytes]() mutable {
+  stateQueue().async([this, record = std::move(record), method, count, bytes, booked = tally()]() mutable {
     stateQueue().assertCurrent();
-    batch_.append(std::move(record), method, count + 1, bytes, combinedSessionIDOnQueue());
+    batch_.append(std::move(record), method, count + 1, bytes, combinedSessionIDOnQueue(), booked);
   });
   return flushed;
 }
 
-// Takes it from the user's account too; what has no room is counted.
-bool HTTPSPostBackend::hasRoomFor(uint64_t batched, uint64_t bytes) const {
+// Takes it from the user's account too; an event without room is dropped.
+bool HTTPSPostBackend::takesRoomFor(uint64_t batched, uint64_t bytes) {
   if (batched + bytes > platform().limits.maxBatchBytes) {
-    countDroppedByLimit();
+    dropEvent(Reason::batchFull);
+    tellDroppedByLimit();
     return false;
   }
   if (userAccount() == nullptr || userAccount()->take(Share::bytes, bytes, kLeftForMessages)) return true;
-  countDroppedByUser();
+  dropEvent(Reason::userBatchesFull);
+  tellDroppedByUser();
   return false;
 }
 
@@ -85,15 +87,15 @@ void HTTPSPostBackend::giveBackToUser(uint64_t bytes) const {
   if (userAccount() != nullptr) userAccount()->giveBack(Share::bytes, bytes);
 }
 
-void HTTPSPostBackend::countDroppedByLimit() const {
-  if (!platform().counters.addAndMayLog(Reason::batchFull, platform().clock.monotonic())) return;
+void HTTPSPostBackend::tellDroppedByLimit() const {
+  if (!platform().counters.addAndMayLog(Reason::batchFull, platform().clock.monotonic(), 0)) return;
   platform().log.error(
       "HTTPSPostBackend(batchEvent): the batch of backend %s is full (%llu bytes), dropping events",
       name().c_str(), static_cast<unsigned long long>(platform().limits.maxBatchBytes));
 }
 
-void HTTPSPostBackend::countDroppedByUser() const {
-  if (!platform().counters.addAndMayLog(Reason::userBatchesFull, platform().clock.monotonic())) return;
+void HTTPSPostBackend::tellDroppedByUser() const {
+  if (!platform().counters.addAndMayLog(Reason::userBatchesFull, platform().clock.monotonic(), 0)) return;
   platform().log.error(
       "HTTPSPostBackend(batchEvent): user %u holds %llu bytes, dropping events of backend %s",
       userAccount()->user(), static_cast<unsigned long long>(userAccount()->holds(Share::bytes)),
@@ -129,7 +131,7 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
   switch (taking) {
     case BatchTaking::discarded:
       giveBackToUser(batch.bytes);
-      platform().counters.add(Reason::batchDiscarded, batch.records.size());
+      batch.events.drop(platform().counters, Reason::batchDiscarded);
       if (lacksUserInfo())
         tellDiscarded(batch.records.size(), "user information was promised and is missing");
       [[fallthrough]];
@@ -144,16 +146,17 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
   }
   platform().log.debug("HTTPSPostBackend(flushMessagesWithCompletion): called");
   const uint64_t bytes = batch.bytes;
-  Array records = recordsToPost(std::move(batch));
-  if (records.empty()) {
+  EventBatch::Taken kept = recordsToPost(std::move(batch));
+  if (kept.records.empty()) {
     giveBackToUser(bytes);
     complete(completion, localError("Nothing to flush: batched events were completely filtered out"));
     return {};
   }
-  return postBatch(std::move(records), bytes, std::move(completion), text);
+  return postBatch(std::move(kept), bytes, std::move(completion), text);
 }
 
-Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion completion, TextOf text) {
+Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, FlushCompletion completion,
+                                  TextOf text) {
   std::optional<BlockingScope> blocking;
   if (bytes >= kTakesLong) blocking.emplace();
   const PostRequest post(configuration_, postFacts());
@@ -161,16 +164,16 @@ Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion
   const bool mayGoBeside =
       !completion && text == TextOf::flush && bytes >= PostLine::kLeastBytes && decision_.postURL;
   if (mayGoBeside && !mayBeShown) {
-    postBeside(std::move(records), bytes);
+    postBeside(std::move(batch.records), std::move(batch.events), bytes);
     return {};
   }
-  PostRequest::Message message = makeMessage(post, std::move(records));
+  PostRequest::Message message = makeMessage(post, std::move(batch.records));
   if (!blocking && message.json.size() >= kTakesLong) blocking.emplace();
   Value pretty;
   if (mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
     pretty = PostRequest::prettyText(message.json);
   if (mayGoBeside && pretty.isNull()) {
-    postBeside(std::move(message), bytes);
+    postBeside(std::move(message), std::move(batch.events), bytes);
   } else {
     giveBackToUser(bytes);  // the request counts by itself
     FlushCompletion answer;
@@ -180,15 +183,17 @@ Value HTTPSPostBackend::postBatch(Array records, uint64_t bytes, FlushCompletion
         completion(pretty, std::move(error));
       };
     postJSONMessage(std::move(message.json), MessageFlag{0}, std::nullopt, std::nullopt, std::move(answer),
-                    message.events);
+                    carried(std::move(batch.events), message.events));
   }
   if (mayBeShown) immutable_ = true;
   return pretty;
 }
 
 // The records count with the user until the request does.
-void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batch, uint64_t bytes) {
-  std::optional<OutgoingPost> post = newPost(MessageFlag{0}, std::nullopt, std::nullopt, nullptr, 0);
+void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batch, BookedEvents events,
+                                  uint64_t bytes) {
+  std::optional<OutgoingPost> post =
+      newPost(MessageFlag{0}, std::nullopt, std::nullopt, nullptr, std::move(events));
   if (!post) return giveBackToUser(bytes);
   line_.add([post = std::move(*post), batch = std::move(batch), bytes]() mutable {
     const std::shared_ptr<UserAccount> account = post.reply.account;
@@ -199,7 +204,7 @@ void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batc
                                        ? post.post.message(std::get<Array>(std::move(batch)))
                                        : std::get<PostRequest::Message>(std::move(batch));
     if (account != nullptr) account->giveBack(Share::bytes, bytes);
-    post.reply.events = message.events;
+    if (message.events == 0) post.reply.events.dropped(Reason::postWithoutClientID);
     std::move(post).send(std::move(message.json));
   });
 }
@@ -224,30 +229,34 @@ bool HTTPSPostBackend::admits(const Dictionary& record) const {
 // The records that the lists admit, each with the user information of now, filtered, over what it had. User information
 // that came after the records makes every one of them larger, and must not make of a batch within its limit a message
 // past all bounds: then the newest are dropped.
-Array HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const {
+EventBatch::Taken HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const {
   Dictionary information;
   if (userInfo() != nullptr) information = *userInfo();
   filterEvent(information);
   const uint64_t limit = platform().limits.maxBatchBytes;
   const bool mayOutgrow = batch.bytes + batch.records.size() * roughSize(information) > limit;
-  uint64_t kept = 0;
-  Array records;
-  records.reserve(batch.records.size());
+  uint64_t bytes = 0;
+  EventBatch::Taken kept;
+  kept.records.reserve(batch.records.size());
+  BookedEventsReader tallies(batch.events);
   Value* values = batch.records.mutableBegin();
   for (size_t i = 0; i < batch.records.size(); ++i) {
     Dictionary* record = values[i].mutableDictionary();
+    Tally* tally = tallies.next();
     if (!admits(*record)) {
-      platform().counters.add(Reason::batchedEventFiltered);
+      dropEvent(tally, Reason::batchedEventFiltered);
       continue;
     }
     record->merge(information);
-    if (mayOutgrow && (kept += roughSize(*record)) > limit) {
-      countDroppedByLimit();
+    if (mayOutgrow && (bytes += roughSize(*record)) > limit) {
+      dropEvent(tally, Reason::batchFull);
+      tellDroppedByLimit();
       continue;
     }
-    records.append(std::move(values[i]));
+    kept.records.append(std::move(values[i]));
+    kept.events.add(tally);
   }
-  return records;
+  return kept;
 }
 
 void HTTPSPostBackend::setCorrelatedSessionID(const SessionIDPath& sessionID) {

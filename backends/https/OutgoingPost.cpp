@@ -11,9 +11,10 @@ void OutgoingPost::send(std::string json) && {
   URLRequest request = post.request(url, std::move(json), eventMap);
   // The poster went away with its session: nothing is sent, and the completion is deliberately never called.
   if (poster == nullptr) {
-    reply.platform.counters.add(Reason::postWithoutPoster, reply.events);
+    reply.events.dropped(Reason::postWithoutPoster);
     return;
   }
+  request.events = reply.events.events();
   reply.address = request.url.substr(0, request.url.find('?'));
   poster->postURLRequestWithCompletionHandler(std::move(request), std::move(reply));
 }

@@ -11,35 +11,58 @@
 
 namespace kyt {
 
+namespace {
+
+Reason fateBy(const Error& error) {
+  switch (error.code) {
+    case kURLErrorWaitingTooMuch:
+      return Reason::postDisplaced;
+    case kURLErrorOutstandingTooMuch:
+      return Reason::postWithoutRoom;
+    case kURLErrorCancelled:
+      return Reason::postCancelled;
+    default:
+      return Reason::postFailed;
+  }
+}
+
+}  // namespace
+
 void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> response,
                            std::optional<Error> error) {
   const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
   const int status = response ? response->status : 0;
   const bool redirected = status >= 300 && status <= 399;
   const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
-  if (error) {
-    if (!redirected && !refused) count(Reason::requestFailed, Reason::postFailed);
+  if (redirected) {
+    tell(status, Reason::requestRedirected, Reason::postRedirected);
+  } else if (refused) {
+    tell(status, Reason::requestRefused, Reason::postRefused);
+  } else if (error) {
+    lose(Reason::requestFailed, fateBy(*error));
+  } else {
+    events.delivered();
+  }
+  if (error)
     platform.log.error("HTTPSPostBackend(postJsonMessage): post error: %s",
                        error->localizedDescription.c_str());
-  }
-  if (redirected) tell(status, Reason::requestRedirected, Reason::postRedirected);
-  if (refused) tell(status, Reason::requestRefused, Reason::postRefused);
   if (status >= 500 && status <= 599) error = disable(status);
   if (completion) completion(Value(), std::move(error));
 }
 
-void PostReply::count(Reason request, Reason lost) const {
+void PostReply::lose(Reason request, Reason fate) {
   platform.counters.add(request);
-  platform.counters.add(lost, events);
+  events.dropped(fate);
 }
 
 // What switches the back end off has a line of its own.
-void PostReply::tell(int status, Reason request, Reason lost) const {
-  platform.counters.add(request);
-  const bool mayLog = platform.counters.addAndMayLog(lost, platform.clock.monotonic(), events);
+void PostReply::tell(int status, Reason request, Reason fate) {
+  const size_t lost = events.size();
+  lose(request, fate);
+  const bool mayLog = platform.counters.addAndMayLog(fate, platform.clock.monotonic(), 0);
   if (mayLog && status < 500)
     platform.log.normal("postJSONMessage: %s answered with status %d, %zu events of backend %s are lost",
-                        address.c_str(), status, events, name.c_str());
+                        address.c_str(), status, lost, name.c_str());
 }
 
 Error PostReply::disable(int status) const {

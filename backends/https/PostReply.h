@@ -9,6 +9,7 @@
 
 #include "backend/KYTReportingBackend.h"
 #include "platform/URLSession.h"
+#include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 
 namespace kyt {
@@ -18,15 +19,15 @@ struct PostReply {
   Platform& platform;
   String name;
   FlushCompletion completion;
-  size_t events;        // that are lost with the message
+  PostedEvents events;  // that are delivered or lost with the message
   std::string address;  // without what a "?" begins
   std::shared_ptr<UserAccount> account;
 
   void operator()(std::optional<Data> data, std::optional<URLResponse> response, std::optional<Error> error);
 
  private:
-  void count(Reason request, Reason lost) const;
-  void tell(int status, Reason request, Reason lost) const;
+  void lose(Reason request, Reason fate);
+  void tell(int status, Reason request, Reason fate);
   [[nodiscard]] Error disable(int status) const;
 };
 

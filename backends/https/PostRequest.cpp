@@ -106,7 +106,6 @@ PostRequest::Message PostRequest::message(Array records) const {
     entries.append("clientId", *facts_.clientID);
     entries.append("events", Value(std::move(records)));
   } else {
-    platform.counters.add(Reason::postWithoutClientID, records.size());
     made.prettySize = 0;
   }
   made.prettySize += entries.size() * roomOfEntries(1) + 1;

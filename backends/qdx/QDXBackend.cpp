@@ -53,9 +53,10 @@ Value QDXBackend::sendMessage(Dictionary message, const TimeValue&, uint16_t met
                               EventID, MessageFlag) {
   if (qdxAdaptor_ != nullptr && qdxAdaptor_->respondsTo(kForwardingOperation)) {
     qdxAdaptor_->invoke(kForwardingOperation, method, respCode, message);
+    eventDelivered();
     return {};
   }
-  platform().counters.add(Reason::adaptorUnavailable);
+  dropEvent(Reason::adaptorUnavailable);
   const std::string adaptor = qdxAdaptor_ != nullptr ? qdxAdaptor_->description() : "(null)";
   platform().log.error("QDXBackend(sendMessage): QDX adaptor %s does not respond to forwarding selector %s",
                        adaptor.c_str(), kForwardingOperation);

@@ -98,6 +98,12 @@ const char* reasonName(Reason reason) {
       return "post-refused";
     case Reason::postRedirected:
       return "post-redirected";
+    case Reason::postDisplaced:
+      return "post-displaced";
+    case Reason::postWithoutRoom:
+      return "post-without-room";
+    case Reason::postCancelled:
+      return "post-cancelled";
     case Reason::requestFailed:
       return "request-failed";
     case Reason::requestRefused:

@@ -64,10 +64,13 @@ enum class Reason : uint8_t {
   postWithoutURL,
   postWithoutPoster,  // the session was gone: nothing was sent
   postWithoutClientID,
-  postFailed,      // ended with a transport error
-  postRefused,     // answered 4xx or 5xx
-  postRedirected,  // answered 3xx, which is not followed
-  requestFailed,   // the posts of events themselves
+  postFailed,       // ended with a transport error
+  postRefused,      // answered 4xx or 5xx
+  postRedirected,   // answered 3xx, which is not followed
+  postDisplaced,    // dropped for newer ones while it waited for connectivity
+  postWithoutRoom,  // too much of its session or user was not answered yet
+  postCancelled,    // cut off by the end of the daemon
+  requestFailed,    // the posts of events themselves
   requestRefused,
   requestRedirected,
   waitingRequestDisplaced,   // a request dropped while waiting for connectivity
@@ -91,6 +94,39 @@ enum class Reason : uint8_t {
 };
 
 [[nodiscard]] const char* reasonName(Reason reason);  // "malformed-message", for logs and tools
+
+// The reasons that are fates: an event that is not delivered has exactly one of them in the books (Books.h). All others
+// count something else (connections, requests, values, decisions), or copies of events.
+inline constexpr std::array kFates = {
+    Reason::notConfigured,
+    Reason::noStorebag,
+    Reason::noBackEnds,
+    Reason::identifiersMissing,
+    Reason::categoryOrTypeMissing,
+    Reason::eventFiltered,
+    Reason::notForThisBackEnd,
+    Reason::adaptorUnavailable,
+    Reason::batchFull,
+    Reason::userBatchesFull,
+    Reason::eventDroppedByState,
+    Reason::batchDiscarded,
+    Reason::batchedEventFiltered,
+    Reason::postWithoutURL,
+    Reason::postWithoutPoster,
+    Reason::postWithoutClientID,
+    Reason::postFailed,
+    Reason::postRefused,
+    Reason::postRedirected,
+    Reason::postDisplaced,
+    Reason::postWithoutRoom,
+    Reason::postCancelled,
+};
+// Its place in kFates; kFates.size() for what is none.
+[[nodiscard]] constexpr size_t fateNumber(Reason reason) {
+  for (size_t i = 0; i < kFates.size(); ++i)
+    if (kFates[i] == reason) return i;
+  return kFates.size();
+}
 
 class Counters {
  public:

@@ -78,6 +78,11 @@ struct Limits {
   // … nor those of one user push out others' lines.
   static constexpr uint64_t maxMessageLogBytesPerUser = maxMessageLogBytes / 4;
   static constexpr size_t maxCustomIdentifiers = 1000;  // "uuid:…" user defaults that the daemon writes
+  // The books' rows stay for the life of the process, and clients choose the names of programs: memory.
+  static constexpr size_t maxBookRows = 1024;
+  static constexpr size_t bookRowsForOthers = 128;  // of these, those named "other"
+  static constexpr size_t maxBookRowsOfUser = 448;  // … and half of the rest, so no user fills it
+  static constexpr size_t maxBookNameBytes = 128;   // what is longer is cut
 };
 
 }  // namespace kyt

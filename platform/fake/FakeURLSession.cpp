@@ -4,6 +4,7 @@
 #include <condition_variable>
 #include <mutex>
 
+#include "platform/base/Books.h"
 #include "platform/queues/SerialQueue.h"
 
 namespace kyt {
@@ -18,7 +19,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
     std::shared_ptr<SerialQueue> queue;
     std::shared_ptr<OutstandingBytes> outstanding;
     size_t charge = 0;
-    bool open = true;
+    bool open = true, waits = false;
   };
 
   explicit State(Executor* executor) : executor_(executor) {}
@@ -69,6 +70,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
       Entry& entry = *entries_.at(index);
       if (!entry.open) return false;
       entry.open = false;
+      setWaiting(entry, false);
       entry.outstanding->user(entry.request.account).giveBack(entry.charge);
       --open_;
       ++(reply.error ? figures_.failed : figures_.completed);
@@ -90,6 +92,14 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
       deliver();
     }
     return true;
+  }
+
+  static void setWaiting(Entry& entry, bool waits) {
+    if (std::exchange(entry.waits, waits) == waits || !entry.request.events) return;
+    if (waits)
+      entry.request.events->beginWaiting();
+    else
+      entry.request.events->endWaiting();
   }
 
   void cancel(size_t index) { fail(index, kURLErrorCancelled, "cancelled"); }
@@ -290,6 +300,12 @@ bool FakeURLSessionFactory::fail(size_t index, Error error) {
 
 bool FakeURLSessionFactory::answer(size_t index, Reply reply) {
   return state_->answer(index, std::move(reply));
+}
+
+void FakeURLSessionFactory::setWaiting(size_t index, bool waits) {
+  std::lock_guard lock(state_->mutex_);
+  State::Entry& entry = *state_->entries_.at(index);
+  if (entry.open) State::setWaiting(entry, waits);
 }
 
 }  // namespace kyt

@@ -64,6 +64,8 @@ class FakeURLSessionFactory final : public URLSessionFactory {
   bool complete(size_t index, int status, Headers headers = {}, std::string_view body = {});
   bool fail(size_t index, Error error);
   bool answer(size_t index, Reply reply);
+  // An open request begins to wait for connectivity, or goes on.
+  void setWaiting(size_t index, bool waits);
 
   class State;
 

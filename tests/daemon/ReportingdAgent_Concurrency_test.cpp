@@ -45,6 +45,7 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
       .pluginBundles = fakes.pluginBundles,
       .powerLog = fakes.powerLog,
       .budget = fakes.budget,
+      .books = fakes.books,
   };
   Configuration configuration{platform, test_.deviceIdentity, test_.environment};
   DefaultBackendFactory factory(configuration, backendTable(configuration));

@@ -22,7 +22,7 @@ SECONDS_BEFORE, SESSIONS_BEFORE, SECONDS_AFTER = 3, 3, 5
 DROPS = ("not-configured", "no-storebag", "no-back-ends", "category-or-type-missing", "event-filtered",
          "not-for-this-back-end", "batch-full", "user-batches-full", "event-dropped-by-state", "batch-discarded",
          "batched-event-filtered", "post-without-url", "post-without-poster", "post-without-client-id", "post-failed",
-         "post-refused", "post-redirected")
+         "post-refused", "post-redirected", "post-displaced", "post-without-room", "post-cancelled")
 
 
 class Round:

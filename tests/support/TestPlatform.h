@@ -7,6 +7,7 @@
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
 #include "platform/Platform.h"
+#include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
@@ -39,6 +40,7 @@ struct TestPlatform {
   Limits limits;
   UserBudget budget{UserShares::of(limits, uint64_t{8} << 30, 65536)};
   Counters counters;
+  Books books;
   MemoryLogSink sink;
   Log log{sink, LogLevel::debug};
   ManualClock clock;
@@ -87,6 +89,7 @@ struct TestPlatform {
       .pluginBundles = pluginBundles,
       .powerLog = powerLog,
       .budget = budget,
+      .books = books,
   };
 
   DeviceIdentity deviceIdentity{platform};

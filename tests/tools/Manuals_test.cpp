@@ -214,6 +214,15 @@ TEST(AdministratorsGuide, NamesEachCounter) {
   EXPECT_EQ(matchesIn(rows, "`([a-z-]+)`"), counters());
 }
 
+TEST(AdministratorsGuide, NamesEachFateOfAnEvent) {
+  const std::string guide = textOf("docs/ADMINISTRATION.md");
+  const size_t at = guide.find("\n## The books\n");
+  ASSERT_NE(at, std::string::npos);
+  Names fates;
+  for (const Reason fate : kFates) fates.insert(reasonName(fate));
+  EXPECT_EQ(matchesIn(guide.substr(at, guide.find("\n## ", at + 1) - at), "\n\\| `([a-z-]+)` \\|"), fates);
+}
+
 TEST(ManualOfTheStorebag, NamesTheKeysOfTheWireFormatsDocument) {
   const std::string document = textOf("docs/WIRE-STOREBAG.md");
   Names keys;

@@ -8,6 +8,7 @@
 #include "backends/dashboard/DashboardBackend.h"
 #include "platform/Bundle.h"
 #include "platform/Platform.h"
+#include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
@@ -45,6 +46,7 @@ struct Machine {
   Log log{sink};
   Limits limits;
   Counters counters;
+  Books books;
   LinuxClock clock;
   std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
   WorkerPool workers{WorkerPoolOptions{}};
@@ -89,6 +91,7 @@ struct Machine {
       .pluginBundles = pluginBundles,
       .powerLog = powerLog,
       .budget = budget,
+      .books = books,
   };
   ~Machine() { end(); }
   // Nothing runs any more; what was counted stays.

@@ -7,6 +7,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/Books.h"
 #include "platform/linux/url/URLSessionState.h"
 
 namespace kyt {
@@ -25,6 +26,7 @@ void WaitingRequests::add(URLTransfer& transfer) {
   line.transfers.append(transfer);
   line.bytes += transfer.waitingCharge;
   ++count_;
+  if (transfer.request.events) transfer.request.events->beginWaiting();
   tools_.figures.add(&URLFigures::waiting);
   tools_.figures.add(&URLFigures::waitingBytes, transfer.request.body.size());
   const std::shared_ptr<URLSessionState> kept = transfer.session;  // displacing may end its last request
@@ -44,6 +46,7 @@ void WaitingRequests::remove(URLTransfer& transfer) {
   line->second.bytes -= std::exchange(transfer.waitingCharge, 0);
   if (line->second.transfers.empty()) transfer.session->waiting.erase(line);
   --count_;
+  if (transfer.request.events) transfer.request.events->endWaiting();
   tools_.figures.subtract(&URLFigures::waiting);
   tools_.figures.subtract(&URLFigures::waitingBytes, transfer.request.body.size());
 }

@@ -79,6 +79,16 @@ TEST_F(LogData, TheEventOfItsLocationIsNotSent) {
   EXPECT_EQ(socket().attempts, 0u);
 }
 
+TEST_F(LogData, TheEventOfItsLocationIsOneOfTheDaemonsOwnInTheBooks) {
+  backend_->setProgram(std::make_shared<const ReportingProgram>(ReportingProgram{1000, 7, "a", "s"}));
+  EXPECT_TRUE(backend_->uploadLogData(entries_));
+  const std::vector<BookRow> rows = platform_.books.snapshot();
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_TRUE(rows[0].isInternal);
+  EXPECT_EQ(rows[0].taken, 1u);
+  EXPECT_EQ(rows[0].droppedFor(Reason::notForThisBackEnd), 1u);
+}
+
 TEST_F(LogData, IsRefusedWithoutAnAddress) {
   ASSERT_NE(makeWithoutProfile(String("192.0.2.7"), 1), nullptr);
   backend_->setReportingSessionConnectivityDelegate(poster_);

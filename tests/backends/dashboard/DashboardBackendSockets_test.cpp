@@ -86,6 +86,7 @@ class DashboardSockets : public ::testing::Test {
       .pluginBundles = fakes_.pluginBundles,
       .powerLog = fakes_.powerLog,
       .budget = fakes_.budget,
+      .books = fakes_.books,
   };
   UDPPeer server_;
   std::shared_ptr<DashboardBackend> backend_;

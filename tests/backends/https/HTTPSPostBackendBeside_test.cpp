@@ -57,6 +57,19 @@ TEST_F(HTTPSPostBackendBeside, ALargeBatchIsPostedByAnotherThread) {
     EXPECT_EQ(events(0)[static_cast<size_t>(i)].find("number")->intValue(), i);
 }
 
+TEST_F(HTTPSPostBackendBeside, EventsThatLeaveTheirMessageForWantOfAClientIDCountOnce) {
+  entry_.set("extras_on_internal", 1);
+  facts_.isInternal = true;
+  facts_.udid = std::nullopt;
+  decided();
+  sendBatch();
+  platform_.executor.runAll();
+  ASSERT_EQ(poster_->requests.size(), 1u);
+  EXPECT_EQ(dropped(Reason::postWithoutClientID), static_cast<uint64_t>(kEvents));
+  poster_->answer(0, 404);
+  EXPECT_EQ(dropped(Reason::postRefused), 0u);
+}
+
 TEST_F(HTTPSPostBackendBeside, ItsRequestIsTheSameAsOnTheSessionsQueue) {
   setDigest();
   decided();

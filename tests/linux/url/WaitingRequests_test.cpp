@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/Books.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
 #include "platform/fake/MemoryLogSink.h"
@@ -80,6 +81,24 @@ TEST_F(WaitingRequestsTest, CountsWhatWaitsAndItsBodies) {
   EXPECT_EQ(figures().waitingBytes, 3000u);
   EXPECT_FALSE(waiting_.empty());
   EXPECT_TRUE(displaced_.empty());
+}
+
+TEST_F(WaitingRequestsTest, TellsTheBooksWhoseEventsWait) {
+  Books books;
+  const auto tally = books.open({1000, 7, "a", "s"}, "httppost", false);
+  BookedEvents events;
+  for (int i = 0; i < 3; ++i) {
+    tally->take();
+    events.add(tally.get());
+  }
+  const PostedEvents posted(std::move(events), counters_);
+  URLTransfer& one = transfer("one", 100);
+  one.request.events = posted.events();
+  waiting_.add(one);
+  EXPECT_EQ(books.snapshot().front().waiting, 3u);
+  waiting_.remove(one);
+  EXPECT_EQ(books.snapshot().front().waiting, 0u);
+  EXPECT_EQ(books.snapshot().front().inFlight, 3u);
 }
 
 TEST_F(WaitingRequestsTest, TheOldestOfAUserGiveWayWhenTooMuchOfItsWaits) {

@@ -1,0 +1,308 @@
+#include "platform/base/Books.h"
+
+#include <algorithm>
+#include <cassert>
+#include <functional>
+#include <map>
+#include <numeric>
+#include <tuple>
+#include <unordered_set>
+
+#include "platform/base/Limits.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/TextEscape.h"
+
+namespace kyt {
+
+namespace {
+
+using Number = std::atomic<uint64_t>;
+
+// What leaves a place is written after it came there, and read before: so no reader sees more leave than came.
+void add(Number& number, uint64_t events) {
+  number.fetch_add(events, std::memory_order_acq_rel);
+}
+uint64_t read(const Number& number) {
+  return number.load(std::memory_order_acquire);
+}
+
+constexpr std::string_view kOther = "other";
+constexpr uint32_t kAllUsers = ~uint32_t{0};
+// Programs without rows that are told from each other.
+constexpr size_t kMostMerged = 4096;
+
+// The longest beginning of whole UTF-8 characters.
+std::string_view cutName(std::string_view name) {
+  if (name.size() <= Limits::maxBookNameBytes) return name;
+  size_t end = Limits::maxBookNameBytes;
+  while (end > 0 && (static_cast<unsigned char>(name[end]) & 0xC0) == 0x80) --end;
+  return name.substr(0, end);
+}
+
+size_t hashOf(const ReportingProgram& program) {
+  const std::string text = std::to_string(program.user) + '/' + std::to_string(program.clientType) + '/' +
+                           std::to_string(program.clientName.size()) + '/' + program.clientName +
+                           program.service;
+  return std::hash<std::string>()(text);
+}
+
+}  // namespace
+
+struct Books::Row {
+  Number postsBegun{0}, postsEnded{0};
+  Number waitsBegun{0}, waitsEnded{0};
+  Number batchesLeft{0};
+  Number delivered{0};
+  std::array<Number, kFates.size()> dropped{};
+
+  // Guarded by the mutex of the books.
+  Tally* first = nullptr;
+  uint64_t taken = 0, batched = 0;  // of tallies that are gone
+  uint64_t programsMerged = 0;
+
+  void fill(BookRow& row) const;
+};
+
+struct Books::State {
+  struct Key {
+    ReportingProgram program;
+    std::string backEnd;
+    bool isInternal = false, isOther = false;
+    friend auto operator<=>(const Key&, const Key&) = default;
+  };
+
+  mutable Mutex mutex;
+  std::map<Key, Row> rows GUARDED_BY(mutex);
+  std::map<uint32_t, size_t> rowsOfUser GUARDED_BY(mutex);
+  size_t rowsOfPrograms GUARDED_BY(mutex) = 0;
+  std::unordered_set<size_t> merged GUARDED_BY(mutex);  // hashes
+
+  Row& row(Key key) REQUIRES(mutex);
+  Row& otherRow(const ReportingProgram& program) REQUIRES(mutex);
+};
+
+// What leaves is read before what came, and each place before the one before it on an event's road: so the events of a row
+// add up to no more than were taken, and what is left over is on its way between two places.
+void Books::Row::fill(BookRow& row) const {
+  row.delivered = read(delivered);
+  for (size_t i = 0; i < kFates.size(); ++i) row.dropped[i] = read(dropped[i]);
+  const uint64_t ended = read(postsEnded);
+  const uint64_t noLongerWaiting = read(waitsEnded);
+  const uint64_t begunToWait = read(waitsBegun);
+  const uint64_t posted = read(postsBegun) - ended;
+  row.waiting =
+      std::min(begunToWait - noLongerWaiting, posted);  // one may have waited more than once meanwhile
+  row.inFlight = posted - row.waiting;
+  const uint64_t left = read(batchesLeft);
+  uint64_t entered = batched;
+  for (const Tally* tally = first; tally != nullptr; tally = tally->next_) entered += read(tally->batched_);
+  row.batched = entered - left;
+  row.taken = taken;
+  for (const Tally* tally = first; tally != nullptr; tally = tally->next_) row.taken += read(tally->taken_);
+  row.queued = row.taken - row.batched - posted - row.delivered - row.droppedInAll();
+  row.programsMerged = programsMerged;
+}
+
+Books::Row& Books::State::row(Key key) {
+  if (const auto known = rows.find(key); known != rows.end()) return known->second;
+  size_t& ofUser = rowsOfUser[key.program.user];
+  const bool hasRoom =
+      rowsOfPrograms < Limits::maxBookRows - Limits::bookRowsForOthers && ofUser < Limits::maxBookRowsOfUser;
+  if (!hasRoom) return otherRow(key.program);
+  ++rowsOfPrograms;
+  ++ofUser;
+  return rows[std::move(key)];
+}
+
+Books::Row& Books::State::otherRow(const ReportingProgram& program) {
+  const auto keyOf = [](uint32_t user) {
+    return Key{{user, 0, std::string(kOther), ""}, std::string(kOther), false, true};
+  };
+  auto found = rows.find(keyOf(program.user));
+  if (found == rows.end()) {
+    // The last one is for all users that come after.
+    const bool isLast = rows.size() - rowsOfPrograms + 1 >= Limits::bookRowsForOthers;
+    found = rows.try_emplace(keyOf(isLast ? kAllUsers : program.user)).first;
+  }
+  if (merged.size() < kMostMerged && merged.insert(hashOf(program)).second) ++found->second.programsMerged;
+  found->second.programsMerged = std::max<uint64_t>(found->second.programsMerged, 1);
+  return found->second;
+}
+
+Books::Books() : state_(std::make_shared<State>()) {}
+Books::~Books() = default;
+
+std::shared_ptr<Tally> Books::open(const ReportingProgram& program, std::string_view backEnd,
+                                   bool isInternal) {
+  State::Key key{{program.user, program.clientType, std::string(cutName(program.clientName)),
+                  std::string(cutName(program.service))},
+                 std::string(cutName(backEnd)),
+                 isInternal,
+                 false};
+  MutexLock lock(state_->mutex);
+  return std::make_shared<Tally>(state_, state_->row(std::move(key)));
+}
+
+std::vector<BookRow> Books::snapshot() const {
+  std::vector<BookRow> rows;
+  MutexLock lock(state_->mutex);
+  rows.reserve(state_->rows.size());
+  for (const auto& [key, row] : state_->rows) {
+    BookRow& filled = rows.emplace_back();
+    filled.program = key.program;
+    filled.backEnd = key.backEnd;
+    filled.isInternal = key.isInternal;
+    row.fill(filled);
+  }
+  return rows;
+}
+
+// Called by open(), which holds the mutex.
+Tally::Tally(std::shared_ptr<Books::State> state, Books::Row& row)
+    : state_(std::move(state)), row_(row), next_(row.first) {
+  if (next_ != nullptr) next_->previous_ = this;
+  row_.first = this;
+}
+
+Tally::~Tally() {
+  MutexLock lock(state_->mutex);
+  row_.taken += taken_.load(std::memory_order_relaxed);
+  row_.batched += batched_.load(std::memory_order_relaxed);
+  (previous_ != nullptr ? previous_->next_ : row_.first) = next_;
+  if (next_ != nullptr) next_->previous_ = previous_;
+}
+
+void Tally::leaveBatch(size_t events) {
+  add(row_.batchesLeft, events);
+}
+void Tally::beginPost(size_t events) {
+  add(row_.postsBegun, events);
+}
+void Tally::endPost(size_t events) {
+  add(row_.postsEnded, events);
+}
+void Tally::beginWaiting(size_t events) {
+  add(row_.waitsBegun, events);
+}
+void Tally::endWaiting(size_t events) {
+  add(row_.waitsEnded, events);
+}
+void Tally::deliver(size_t events) {
+  add(row_.delivered, events);
+}
+void Tally::drop(Reason fate, size_t events) {
+  const size_t number = fateNumber(fate);
+  assert(number < kFates.size());
+  add(row_.dropped[number], events);
+}
+
+BookedEvents BookedEvents::unbooked(size_t events) {
+  BookedEvents made;
+  made.add(nullptr, events);
+  return made;
+}
+
+void BookedEvents::add(Tally* tally, size_t events) {
+  if (events == 0) return;
+  size_ += events;
+  if (runs_.empty() || runs_.back().tally.get() != tally)
+    runs_.push_back({tally != nullptr ? tally->shared_from_this() : nullptr, 0});
+  runs_.back().events += events;
+}
+
+template <typename Operation>
+void BookedEvents::forEachRun(Operation operation) const {
+  for (const Run& run : runs_)
+    if (run.tally) operation(*run.tally, run.events);
+}
+
+void BookedEvents::leaveBatch() const {
+  forEachRun([](Tally& tally, size_t events) { tally.leaveBatch(events); });
+}
+void BookedEvents::beginPost() const {
+  forEachRun([](Tally& tally, size_t events) { tally.beginPost(events); });
+}
+void BookedEvents::endPost() const {
+  forEachRun([](Tally& tally, size_t events) { tally.endPost(events); });
+}
+void BookedEvents::beginWaiting() const {
+  forEachRun([](Tally& tally, size_t events) { tally.beginWaiting(events); });
+}
+void BookedEvents::endWaiting() const {
+  forEachRun([](Tally& tally, size_t events) { tally.endWaiting(events); });
+}
+void BookedEvents::deliver() const {
+  forEachRun([](Tally& tally, size_t events) { tally.deliver(events); });
+}
+void BookedEvents::drop(Counters& counters, Reason fate) const {
+  counters.add(fate, size_);
+  forEachRun([fate](Tally& tally, size_t events) { tally.drop(fate, events); });
+}
+
+Tally* BookedEventsReader::next() {
+  if (run_ == end_) return nullptr;
+  Tally* tally = run_->tally.get();
+  if (++read_ == run_->events) {
+    ++run_;
+    read_ = 0;
+  }
+  return tally;
+}
+
+PostedEvents::PostedEvents(BookedEvents events, Counters& counters)
+    : events_(std::make_shared<const BookedEvents>(std::move(events))), counters_(&counters) {
+  events_->beginPost();
+}
+
+PostedEvents::~PostedEvents() {
+  if (events_) dropped(Reason::postCancelled);
+}
+
+std::shared_ptr<const BookedEvents> PostedEvents::close() {
+  if (events_) events_->endPost();
+  return std::move(events_);
+}
+
+void PostedEvents::delivered() {
+  if (const auto events = close()) events->deliver();
+}
+
+void PostedEvents::dropped(Reason fate) {
+  if (const auto events = close()) events->drop(*counters_, fate);
+}
+
+uint64_t BookRow::droppedInAll() const {
+  return std::accumulate(dropped.begin(), dropped.end(), uint64_t{0});
+}
+
+std::string describeRow(const BookRow& row) {
+  const auto name = [](const std::string& text) {
+    std::string shown = "\"";
+    for (const char c : escapedText(text)) {
+      if (c == '"') shown += '\\';
+      shown += c;
+    }
+    return shown += '"';
+  };
+  std::string line = "user=" + std::to_string(row.program.user) +
+                     " type=" + std::to_string(row.program.clientType) +
+                     " client=" + name(row.program.clientName) + " service=" + name(row.program.service) +
+                     " back-end=" + row.backEnd + (row.isInternal ? " internal" : "");
+  if (row.programsMerged != 0) line += " programs=" + std::to_string(row.programsMerged);
+  const auto figure = [&line](const char* key, uint64_t number) {
+    line.append(" ").append(key).append("=").append(std::to_string(number));
+  };
+  figure("taken", row.taken);
+  figure("queued", row.queued);
+  figure("batched", row.batched);
+  figure("in-flight", row.inFlight);
+  figure("waiting", row.waiting);
+  figure("outbox", row.outbox);
+  figure("delivered", row.delivered);
+  figure("dropped", row.droppedInAll());
+  for (size_t i = 0; i < kFates.size(); ++i)
+    if (row.dropped[i] != 0) figure(reasonName(kFates[i]), row.dropped[i]);
+  return line;
+}
+
+}  // namespace kyt
