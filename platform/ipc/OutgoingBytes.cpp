@@ -7,7 +7,8 @@ namespace kyt {
 std::string& OutgoingBytes::end() {
   if (last_.size() >= kFull) {
     fullBytes_ += last_.size();
-    full_.push_back(std::exchange(last_, std::string()));
+    full_.push_back(std::move(last_));
+    last_ = {};
     last_.reserve(kRoom);
   }
   return last_;
