@@ -30,6 +30,10 @@ struct SessionFacts {
 
   // "major.middle.minor"; missing or unreadable parts are 0, each is kept modulo 256.
   void setSelfVersion(const String& version);
+  // As records and requests have it: "3.1", or "3.1.2".
+  [[nodiscard]] std::string versionText() const {
+    return std::to_string(selfVersion[0]) + "." + std::to_string(selfVersion[1]) + versionSuffix();
+  }
   // "." and the minor, or nothing when that is 0.
   [[nodiscard]] std::string versionSuffix() const;
   void setStartTimestamp(const TimeValue& timestamp) { startTimeStamp = timestamp.asSeconds(); }

@@ -40,6 +40,13 @@ std::string shown(const Array* list) {
   return description(list != nullptr ? Value(*list) : Value());
 }
 
+Value valueOf(const String* text) {
+  return text != nullptr ? Value(*text) : Value();
+}
+Value valueOf(const Array* list) {
+  return list != nullptr ? Value(*list) : Value();
+}
+
 // The threshold of the first element of the list whose countries hold this one; null when none does.
 const Dictionary* countrySampling(const Dictionary& entry, const String* country) {
   const Array* thresholds = entry.array("per_country_sampling_thresholds");
@@ -117,7 +124,9 @@ int32_t ClientRules::decide(Decision& decision, const Dictionary* userInfo, std:
               userInfo->string(kKYTReportingUserInfoServiceName)};
   applyExpedite(decision, client);
   if (!facts_.session->requireUserInfo) return enableWithoutUserInfo(decision);
-  if (userInfo == nullptr || userInfo->empty()) return kBackendStateUndecided;
+  if (!judged("user-information", userInfo != nullptr && !userInfo->empty(),
+              userInfo != nullptr ? Value(*userInfo) : Value()))
+    return kBackendStateUndecided;
   const std::optional<String> known = platform_.deviceProperties.countryCode();
   const String* country = known ? &*known : nullptr;
   const Dictionary* entry = chosenEntry(client);
@@ -154,16 +163,23 @@ int32_t ClientRules::enableWithoutUserInfo(Decision& decision) const {
     break;
   }
   resetBackendStateWithClient(decision, taken);
+  judged("post-url", decision.postURL.has_value(), valueOf(decision.postURL ? &*decision.postURL : nullptr));
   return kBackendStateEnabled;
 }
 
 const Dictionary* ClientRules::chosenEntry(const Client& client) const {
   for (const Value& element : *facts_.clients) {
     const Dictionary* entry = element.dictionary();
-    if (entry != nullptr && matchClientNameAndServiceID(*entry, client.name, client.service) &&
-        isFrameworkEnabledForClient(*entry))
+    if (entry == nullptr) continue;
+    // Whoever is listed elsewhere is looked for in entry after entry: only the one that fits is worth telling.
+    if (!matchClientNameAndServiceID(*entry, client.name, client.service)) continue;
+    judged("client", true, valueOf(client.name), valueOf(entry->string("client")));
+    judged("service", true, valueOf(client.service), valueOf(entry->string("service")));
+    if (judged("version", isFrameworkEnabledForClient(*entry), facts_.session->versionText(),
+               valueOf(entry->string("enabledSince"))))
       return entry;
   }
+  judged("client", false, valueOf(client.name), *facts_.clients);
   return nullptr;
 }
 
@@ -171,7 +187,7 @@ bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const
                               const String* country) const {
   if (!passesConsent(decision, entry, client) || !passesLists(entry, client, country)) return false;
   const Array* filters = entry.array("filters");
-  if (filters == nullptr) {
+  if (!judged("filters", filters != nullptr, valueOf(filters))) {
     platform_.log.error("HTTPSPostBackend(updateBackendState): filters are required.");
     return false;
   }
@@ -181,6 +197,8 @@ bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const
 
 bool ClientRules::passesConsent(Decision& decision, const Dictionary& entry, const Client& client) const {
   const int32_t overrideDnu = entry.integer("override_dnu");
+  judged("consent", overrideDnu == 1 || facts_.dnuEnabled, facts_.dnuEnabled,
+         overrideDnu == 1 ? "overridden by override_dnu" : "required");
   if (overrideDnu == 1) {
     decision.dnuType = facts_.dnuEnabled ? 2 : 1;
     return true;
@@ -197,7 +215,7 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
   // The list is required, so it is matched by the rule that fails without one. By the same rule a device
   // whose country is not known passes: deliberate, servers count on hearing from those.
   const Array* locales = entry.array("locale_whitelist");
-  if (!matchStringWithList(locales, country, false)) {
+  if (!judged("country", matchStringWithList(locales, country, false), valueOf(country), valueOf(locales))) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
                 shown(country).c_str(), shown(locales).c_str());
@@ -206,7 +224,7 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
   }
   const String* family = facts_.session->productFamily ? &*facts_.session->productFamily : nullptr;
   const Array* devices = entry.array("device_whitelist");
-  if (!matchStringWithList(devices, family, true)) {
+  if (!judged("device", matchStringWithList(devices, family, true), valueOf(family), valueOf(devices))) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s",
                 shown(family).c_str(), shown(devices).c_str());
@@ -215,7 +233,8 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
   }
   const String* hardware = facts_.session->hardwareType ? &*facts_.session->hardwareType : nullptr;
   const Array* excluded = entry.array("device_blacklist");
-  if (matchStringWithList(excluded, hardware, false)) {
+  if (!judged("device-excluded", !matchStringWithList(excluded, hardware, false), valueOf(hardware),
+              valueOf(excluded))) {
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s",
                 shown(hardware).c_str(), shown(excluded).c_str());
@@ -238,6 +257,8 @@ int32_t ClientRules::decideBySampling(Decision& decision, const Dictionary& entr
     threshold = std::move(changed);
   }
   decision.samplingThreshold = threshold;
+  judged("sampling", !threshold.isNull() && facts_.samplingFactor <= threshold.doubleValue(),
+         facts_.samplingFactor, threshold);
   if (threshold.isNull()) {
     tellWhyNot(Reason::samplingThresholdMissing, client, "the storebag's entry has no sampling_threshold");
     return kBackendStateDisabled;
@@ -247,9 +268,10 @@ int32_t ClientRules::decideBySampling(Decision& decision, const Dictionary& entr
   const Value* second = entry.find("override_sampling");
   decision.overrideSampling = second != nullptr ? *second : Value();
   // "Greater than" and no other test: an override that is not a number holds the back end.
-  if (!decision.overrideSampling.isNull() && facts_.samplingFactor > decision.overrideSampling.doubleValue())
-    return kBackendStateDisabled;
-  return kBackendStateHeld;
+  const bool isOver =
+      !decision.overrideSampling.isNull() && facts_.samplingFactor > decision.overrideSampling.doubleValue();
+  judged("override-sampling", !isOver, facts_.samplingFactor, decision.overrideSampling);
+  return isOver ? kBackendStateDisabled : kBackendStateHeld;
 }
 
 void ClientRules::takeSettings(Decision& decision, const Dictionary& entry, const Client& client,
@@ -263,6 +285,7 @@ void ClientRules::takeSettings(Decision& decision, const Dictionary& entry, cons
               facts_.name.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), state,
               facts_.samplingFactor);
   updatePostLink(decision, entry);
+  judged("post-url", decision.postURL.has_value(), valueOf(decision.postURL ? &*decision.postURL : nullptr));
   if (const Array* list = entry.array("event_whitelist")) {
     decision.eventWhitelist = *list;
     log.debugObjects("HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@",

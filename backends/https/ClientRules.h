@@ -10,6 +10,7 @@
 
 #include "backend/SessionFacts.h"
 #include "backends/https/Decision.h"
+#include "backends/https/RuleWitness.h"
 #include "platform/base/Counters.h"
 #include "platform/objects/Value.h"
 
@@ -28,6 +29,9 @@ class ClientRules {
     bool dnuEnabled = false;    // the user's consent to diagnostics-and-usage upload
   };
   ClientRules(Platform& platform, Facts facts);
+
+  // Null, as at first: nobody. It outlives this.
+  void setWitness(RuleWitness* witness) { witness_ = witness; }
 
   // The new state; the rest goes into the decision. `userInfo` may be null. `owner` is the user who gets a new custom
   // identifier.
@@ -58,12 +62,18 @@ class ClientRules {
                                          const String* country) const;
   void takeSettings(Decision& decision, const Dictionary& entry, const Client& client, int32_t state,
                     std::optional<uint32_t> owner);
+  // Returns `passes`.
+  bool judged(const char* rule, bool passes, const Value& value, const Value& wanted = {}) const {
+    if (witness_ != nullptr) witness_->judged(rule, passes, value, wanted);
+    return passes;
+  }
   void tellWhyNot(Reason reason, const Client& client, const char* why) const;
   [[nodiscard]] String getPersistentIdentifierForCustomClientIDSuffix(const Client& client,
                                                                       std::optional<uint32_t> owner);
 
   Platform& platform_;
   const Facts facts_;
+  RuleWitness* witness_ = nullptr;
   // The custom identifiers that were made by their keys: one that cannot be stored must not change.
   std::vector<std::pair<std::string, String>> madeIdentifiers_;
 };

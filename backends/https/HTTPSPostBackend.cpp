@@ -138,9 +138,13 @@ Dictionary HTTPSPostBackend::newEventDictfromPayload(Dictionary payload, const T
                          combinedSessionIDString(), userInfo() != nullptr ? userInfo()->size() : 0);
 }
 
-void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const {
+void HTTPSPostBackend::mergeInformation(Dictionary& event, const Dictionary* frameworkData) const {
   if (userInfo() != nullptr) event.merge(*userInfo());
   if (frameworkData != nullptr) event.merge(*frameworkData);
+}
+
+void HTTPSPostBackend::prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const {
+  mergeInformation(event, frameworkData);
   filterEvent(event);
 }
 

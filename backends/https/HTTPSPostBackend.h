@@ -59,8 +59,9 @@ class HTTPSPostBackend : public KYTReportingBackend {
   // The record of one event: a copy of the payload, and the fixed keys over it. `eventID` is ignored.
   [[nodiscard]] Dictionary newEventDictfromPayload(Dictionary payload, const TimeValue& timestamp,
                                                    uint16_t method, uint16_t respCode, EventID eventID) const;
-  // Merges the user information, then `frameworkData` (which may be null), each over what is there, then
-  // filters.
+  // Merges the user information, then `frameworkData` (which may be null), each over what is there.
+  void mergeInformation(Dictionary& event, const Dictionary* frameworkData) const;
+  // The same, then filters.
   void prepareEventForMessage(Dictionary& event, const Dictionary* frameworkData) const;
 
   // Whether "post_url" was taken from this client entry.
@@ -92,6 +93,8 @@ class HTTPSPostBackend : public KYTReportingBackend {
                        std::optional<uint16_t> responseCode, FlushCompletion completion,
                        BookedEvents events = BookedEvents::unbooked(1));
 
+  // Is told the rules of later decisions. Null, as at first: nobody. It outlives the back end.
+  void setRuleWitness(RuleWitness* witness) { rules_.setWitness(witness); }
   [[nodiscard]] const std::optional<String>& postURL() const { return decision_.postURL; }
   void setPostURL(std::optional<String> value) { decision_.postURL = std::move(value); }
   [[nodiscard]] const std::optional<String>& realtimePostURL() const { return decision_.realtimePostURL; }

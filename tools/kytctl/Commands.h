@@ -39,6 +39,21 @@ struct CheckOptions {
   std::string user;  // a name or a number: any client of that user
 };
 
+struct ExplainOptions {
+  std::string event;  // JSON, or "-": standard input
+  int clientType = 0;
+  uint32_t sessionID = 1;
+  uint16_t clientVersion = 1;
+  std::string client, service;  // names; empty: none
+  std::string userInfoJSON;     // instead of the two
+  std::string sessionInfoJSON;  // instead of the four before
+  bool requireUserInfo = false, batch = false, single = false;
+  std::string storebag;  // a file; empty: the server's
+  CheckOptions program;  // neither: any process of the user who asks
+  double draw = -1;      // below 0: all are tried
+  bool json = false;
+};
+
 [[nodiscard]] int sendCommand(const ConnectionOptions& connection, const SendOptions& options);
 [[nodiscard]] int sessionCommand(const ConnectionOptions& connection, const std::string& script);
 
@@ -53,6 +68,13 @@ struct CheckOptions {
 
 // Tells why a client is served (0) or refused (1); 2: that cannot be told.
 [[nodiscard]] int entitlementsCheckCommand(const std::string& root, const CheckOptions& options);
+
+// The same without output: what was looked at goes to `lines`. Exactly one of process and user is given.
+[[nodiscard]] int checkEntitlement(const std::string& root, const CheckOptions& options,
+                                   std::vector<std::string>& lines);
+
+// Tells what becomes of an event on this device: it leaves (0), it does not (1), or that cannot be told (2).
+[[nodiscard]] int explainCommand(const std::string& root, const ExplainOptions& options);
 
 [[nodiscard]] int makeKeysCommand(const std::string& folder, unsigned bits);
 [[nodiscard]] int signCommand(const SignOptions& options);

@@ -30,26 +30,33 @@ namespace {
 
 constexpr int kGranted = 0, kRefused = 1, kCannotTell = 2;
 
-__attribute__((format(printf, 1, 2))) void say(const char* format, ...) {
-  va_list arguments;
-  va_start(arguments, format);
-  char text[4096];
-  std::vsnprintf(text, sizeof text, format, arguments);
-  va_end(arguments);
-  std::printf("%s\n", escapedText(text).c_str());
-}
+// What is told, line by line.
+class Lines {
+ public:
+  explicit Lines(std::vector<std::string>& lines) : lines_(lines) {}
+  __attribute__((format(printf, 2, 3))) void say(const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    char text[4096];
+    std::vsnprintf(text, sizeof text, format, arguments);
+    va_end(arguments);
+    lines_.emplace_back(text);
+  }
+  int cannotTell(const std::string& why) {
+    say("cannot tell: %s", why.c_str());
+    return kCannotTell;
+  }
 
-int cannotTell(const std::string& why) {
-  say("cannot tell: %s", why.c_str());
-  return kCannotTell;
-}
+ private:
+  std::vector<std::string>& lines_;
+};
 
-void sayClient(const EntitlementClient& client) {
+void sayClient(Lines& out, const EntitlementClient& client) {
   if (client.isProcess)
-    say("process %d runs %s", client.peer.pid,
-        client.program.empty() ? "a program that may not be looked at" : client.program.c_str());
-  say("user %s, groups %s", userText(client.peer.uid).c_str(), client.groupsText().c_str());
-  if (!client.peer.securityLabel.empty()) say("security label %s", client.peer.securityLabel.c_str());
+    out.say("process %d runs %s", client.peer.pid,
+            client.program.empty() ? "a program that may not be looked at" : client.program.c_str());
+  out.say("user %s, groups %s", userText(client.peer.uid).c_str(), client.groupsText().c_str());
+  if (!client.peer.securityLabel.empty()) out.say("security label %s", client.peer.securityLabel.c_str());
 }
 
 // ---- The daemon's user.
@@ -131,8 +138,8 @@ enum class Answer : uint8_t { matches, unknown, differs };  // of several the la
 
 class Check {
  public:
-  Check(const EntitlementClient& client, bool servicesView, ProgramInspector& inspector)
-      : client_(client), servicesView_(servicesView), match_(client.peer, inspector, numbers_) {}
+  Check(Lines& lines, const EntitlementClient& client, bool servicesView, ProgramInspector& inspector)
+      : out_(lines), client_(client), servicesView_(servicesView), match_(client.peer, inspector, numbers_) {}
 
   // Tells each criterion; all of them, so that a second fault is seen before the first is mended.
   Answer grant(const EntitlementGrant& grant) {
@@ -157,7 +164,7 @@ class Check {
     const char* const verb = answer == Answer::matches   ? "matches"
                              : answer == Answer::differs ? "does not match"
                                                          : "cannot be judged";
-    say("    %s: %s%s%s", criterion.c_str(), verb, why.empty() ? "" : ": ", why.c_str());
+    out_.say("    %s: %s%s%s", criterion.c_str(), verb, why.empty() ? "" : ": ", why.c_str());
     answer_ = std::max(answer_, answer);
   }
   void tell(const std::string& criterion, bool matches, const std::string& why) {
@@ -211,21 +218,23 @@ class Check {
   }
 
   // A number in quotes is a name, which hardly anybody has.
-  static void noteDigits(const char* key, const NameOrNumber& who) {
+  void noteDigits(const char* key, const NameOrNumber& who) const {
     const auto* const name = std::get_if<std::string>(&who);
     if (name == nullptr || name->find_first_not_of("0123456789") != std::string::npos) return;
-    say("      warning: \"%s\" in quotes is a name; a number is written without: %s = %s", name->c_str(), key,
-        name->c_str());
+    out_.say("      warning: \"%s\" in quotes is a name; a number is written without: %s = %s", name->c_str(),
+             key, name->c_str());
   }
 
   void noteHidden(const std::string& path) const {
     if (!servicesView_) return;
     for (const char* hidden : {"/home", "/root", "/run/user", "/tmp", "/var/tmp"})
       if (path.starts_with(std::string(hidden) + "/"))
-        say("      note: as a service (kytreportingd.service) the daemon does not see %s, and this never matches",
+        out_.say(
+            "      note: as a service (kytreportingd.service) the daemon does not see %s, and this never matches",
             hidden);
   }
 
+  Lines& out_;
   const EntitlementClient& client_;
   const bool servicesView_;
   AccountNumbers numbers_;
@@ -238,32 +247,32 @@ struct Outcome {
   bool mayBeGranted = false;  // something that counts could not be judged or read
 };
 
-void checkGrants(const EntitlementsFile& file, Check& check, Outcome& outcome) {
+void checkGrants(Lines& out, const EntitlementsFile& file, Check& check, Outcome& outcome) {
   for (const EntitlementGrant& grant : file.grants) {
     const auto value = grant.values.find(kEntitlement);
     if (value == grant.values.end()) {
-      say("  line %u: grants other entitlements only", grant.line);
+      out.say("  line %u: grants other entitlements only", grant.line);
       continue;
     }
-    say("  line %u: %s = %s", grant.line, std::string(kEntitlement).c_str(), text(value->second).c_str());
+    out.say("  line %u: %s = %s", grant.line, std::string(kEntitlement).c_str(), text(value->second).c_str());
     const Answer answer = check.grant(grant);
     const bool grants = value->second.boolValue();
     outcome.mayBeGranted |= answer == Answer::unknown && grants;
-    say("    so it %s", answer == Answer::unknown   ? "cannot be judged"
-                        : answer == Answer::differs ? "does not match"
-                        : grants                    ? "matches, and grants it"
-                                                    : "matches, and that value is no");
+    out.say("    so it %s", answer == Answer::unknown   ? "cannot be judged"
+                            : answer == Answer::differs ? "does not match"
+                            : grants                    ? "matches, and grants it"
+                                                        : "matches, and that value is no");
   }
 }
 
-void checkFile(const EntitlementsFile& file, Check& check, Outcome& outcome) {
-  say("%s", file.path.c_str());
-  for (const TomlError& problem : file.problems) say("  %s", problem.text.c_str());
+void checkFile(Lines& out, const EntitlementsFile& file, Check& check, Outcome& outcome) {
+  out.say("%s", file.path.c_str());
+  for (const TomlError& problem : file.problems) out.say("  %s", problem.text.c_str());
   if (file.ignored && file.identity.exists())
-    say("  its mode is %04o, its owner %s", file.identity.mode & 07777U,
-        userText(file.identity.owner).c_str());
-  if (!file.ignored && file.grants.empty()) say("  has no grant");
-  checkGrants(file, check, outcome);
+    out.say("  its mode is %04o, its owner %s", file.identity.mode & 07777U,
+            userText(file.identity.owner).c_str());
+  if (!file.ignored && file.grants.empty()) out.say("  has no grant");
+  checkGrants(out, file, check, outcome);
 }
 
 class NoSink final : public LogSink {
@@ -282,29 +291,26 @@ bool isGranted(const TomlEntitlementsOptions& options, const PeerCredentials& pe
   return entitlements.valueFor(peer, kEntitlement).boolValue();
 }
 
-int verdict(bool granted, bool mayBeGranted, const EntitlementClient& client) {
-  if (client.hasEnded()) return cannotTell("the process has ended meanwhile");
+int verdict(Lines& out, bool granted, bool mayBeGranted, const EntitlementClient& client) {
+  if (client.hasEnded()) return out.cannotTell("the process has ended meanwhile");
   if (granted) {
-    say("granted: this client is served");
+    out.say("granted: this client is served");
     return kGranted;
   }
-  if (mayBeGranted) return cannotTell("it depends on what could not be judged above");
-  say("refused: no grant matches");
+  if (mayBeGranted) return out.cannotTell("it depends on what could not be judged above");
+  out.say("refused: no grant matches");
   return kRefused;
 }
 
 }  // namespace
 
-int entitlementsCheckCommand(const std::string& root, const CheckOptions& options) {
-  if (options.user.empty() == (options.pid == 0)) {
-    failed("say either --pid or --user");
-    return kCannotTell;
-  }
+int checkEntitlement(const std::string& root, const CheckOptions& options, std::vector<std::string>& lines) {
+  Lines out(lines);
   auto found =
       options.pid != 0 ? EntitlementClient::ofProcess(options.pid) : EntitlementClient::ofUser(options.user);
-  if (const auto* wrong = std::get_if<std::string>(&found)) return cannotTell(*wrong);
+  if (const auto* wrong = std::get_if<std::string>(&found)) return out.cannotTell(*wrong);
   const EntitlementClient& client = std::get<EntitlementClient>(found);
-  sayClient(client);
+  sayClient(out, client);
 
   const auto daemon = daemonUser(root);
   TomlEntitlementsOptions files{root + "/etc/kytreportingd/entitlements.d", std::nullopt};
@@ -315,25 +321,36 @@ int entitlementsCheckCommand(const std::string& root, const CheckOptions& option
   {
     const AsDaemon view(daemon);
     const bool isDaemonsView = daemon && daemon->user == ::geteuid();
-    if (isDaemonsView) say("files are read as the daemon's user, %s", userText(::geteuid()).c_str());
+    if (isDaemonsView) out.say("files are read as the daemon's user, %s", userText(::geteuid()).c_str());
     const EntitlementsListing listing = entitlementsFiles(files.folder);
     if (listing.error != 0) {
-      say("%s: %s", files.folder.c_str(), errorText(listing.error).c_str());
+      out.say("%s: %s", files.folder.c_str(), errorText(listing.error).c_str());
       outcome.mayBeGranted = listing.error != ENOENT && !isDaemonsView;
     }
-    Check check(client, root.empty(), inspector);
+    Check check(out, client, root.empty(), inspector);
     for (const std::string& name : listing.names) {
       const EntitlementsFile file = readEntitlementsFile(files.folder + "/" + name, files.trustedUser);
       outcome.mayBeGranted |= file.unreadable && !isDaemonsView;
-      checkFile(file, check, outcome);
+      checkFile(out, file, check, outcome);
     }
     for (const std::string& name : listing.others) {
-      say("%s/%s", files.folder.c_str(), name.c_str());
-      say("  is not read: its name must end in .toml and not begin with a point");
+      out.say("%s/%s", files.folder.c_str(), name.c_str());
+      out.say("  is not read: its name must end in .toml and not begin with a point");
     }
     granted = isGranted(files, client.peer, inspector);
   }
-  return verdict(granted, outcome.mayBeGranted, client);
+  return verdict(out, granted, outcome.mayBeGranted, client);
+}
+
+int entitlementsCheckCommand(const std::string& root, const CheckOptions& options) {
+  if (options.user.empty() == (options.pid == 0)) {
+    failed("say either --pid or --user");
+    return kCannotTell;
+  }
+  std::vector<std::string> lines;
+  const int status = checkEntitlement(root, options, lines);
+  for (const std::string& line : lines) std::printf("%s\n", escapedText(line).c_str());
+  return status;
 }
 
 }  // namespace kyt::tools

@@ -12,6 +12,7 @@ struct Arguments {
   SendOptions send;
   SignOptions sign;
   CheckOptions check;
+  ExplainOptions explain;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
   int status = 0;
@@ -37,6 +38,12 @@ constexpr char kSessionSteps[] =
   {"do":"finish"}                                  sends what is queued and prints the figures
 
 The manual page kytctl tells more.)";
+
+constexpr char kExplained[] =
+    R"(The event is a JSON object as it goes over the wire, or - for standard input:
+  {"Category":10,"Type":1,"Payload":{"step":1},"Flag":0}
+Nothing is sent and nothing is stored; no daemon needs to run. What servers answer is not known here.
+The exit status is 0 when the event leaves, 1 when it does not, and 2 when that cannot be told.)";
 
 void addConnectionOptions(CLI::App& command, Arguments& arguments) {
   command.add_option("--socket", arguments.connection.socket,
@@ -68,6 +75,38 @@ void addSend(CLI::App& app, Arguments& a) {
   session->add_option("script", a.script, "A file, or - for standard input")->required();
   session->footer(kSessionSteps);
   session->callback([&a] { a.status = sessionCommand(a.connection, a.script); });
+}
+
+void addExplain(CLI::App& app, Arguments& a) {
+  CLI::App* explain = app.add_subcommand("explain", "Tell what becomes of an event on this device, and why");
+  ExplainOptions& o = a.explain;
+  explain->add_option("event", o.event, "A JSON object, or - for standard input")->required();
+  CLI::Option* information = explain->add_option("--session-info", o.sessionInfoJSON,
+                                                 "The session's information, a JSON object, as it is sent");
+  for (CLI::Option* part :
+       {explain->add_option("--client-type", o.clientType, "The client type, 0 to 23"),
+        explain->add_option("--session-id", o.sessionID, "The session ID, 32 bits"),
+        explain->add_option("--client-version", o.clientVersion, "The client version, 16 bits"),
+        explain->add_flag("--require-user-info", o.requireUserInfo, "The session promises user information"),
+        explain->add_flag("--batch", o.batch, "The session batches its events")})
+    part->excludes(information);
+  CLI::Option* userInfo =
+      explain->add_option("--user-info", o.userInfoJSON, "The user information, a JSON object");
+  explain->add_option("--client", o.client, "The client's name in the user information")->excludes(userInfo);
+  explain->add_option("--service", o.service, "The service's name in the user information")
+      ->excludes(userInfo);
+  explain->add_flag("--single", o.single, "A single message, without a session");
+  explain->add_option("--storebag", o.storebag,
+                      "A document, or a bag not signed yet (.json, .toml, .plist), instead of the server's");
+  CLI::Option* pid = explain->add_option("--pid", o.program.pid, "The program, a process")
+                         ->check(CLI::Range(1, std::numeric_limits<int32_t>::max()));
+  explain->add_option("--user", o.program.user, "Any process of a user instead; your own without either")
+      ->excludes(pid);
+  explain->add_option("--draw", o.draw, "The session's sampling draw, 0 to 1; all are tried without")
+      ->check(CLI::Range(0.0, 1.0));
+  explain->add_flag("--json", o.json, "Print one JSON object");
+  explain->footer(kExplained);
+  explain->callback([&a] { a.status = explainCommand(a.connection.root, a.explain); });
 }
 
 void addDefaults(CLI::App& app, Arguments& a) {
@@ -150,6 +189,7 @@ int main(int argc, char** argv) {
   app.require_subcommand(1);
   app.fallthrough();
   addSend(app, arguments);
+  addExplain(app, arguments);
   addDefaults(app, arguments);
   addEntitlements(app, arguments);
   addStorebag(app, arguments);

@@ -7,7 +7,8 @@ function __kytctl_words
         if test $value = 1
             set value 0
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
-                --payload --user-info --type --pid --user --bits --key -o --output --public-key
+                --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
+                --service --storebag --draw
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -63,6 +64,7 @@ complete -c kytctl -l root -x -a '(__fish_complete_directories)' -d 'A folder in
 
 complete -c kytctl -n __kytctl_at -a send -d 'Send one event'
 complete -c kytctl -n __kytctl_at -a session -d 'Run a scripted session'
+complete -c kytctl -n __kytctl_at -a explain -d 'What becomes of an event'
 complete -c kytctl -n __kytctl_at -a defaults -d 'Read and change user defaults'
 complete -c kytctl -n __kytctl_at -a consent -d 'The consent of the owner'
 complete -c kytctl -n __kytctl_at -a entitlements -d 'Who may connect'
@@ -78,14 +80,26 @@ for command in send session
     complete -c kytctl -n "__kytctl_at -b $command" -l socket -r -F -d 'The socket of the daemon'
     complete -c kytctl -n "__kytctl_at -b $command" -l timeout -x -d 'Seconds to wait for the daemon'
 end
-complete -c kytctl -n '__kytctl_at -b send' -l client-type -x -d 'The client type, 0 to 23'
-complete -c kytctl -n '__kytctl_at -b send' -l session-id -x -d 'The session ID'
-complete -c kytctl -n '__kytctl_at -b send' -l client-version -x -d 'The client version'
+for command in send explain
+    complete -c kytctl -n "__kytctl_at -b $command" -l client-type -x -d 'The client type, 0 to 23'
+    complete -c kytctl -n "__kytctl_at -b $command" -l session-id -x -d 'The session ID'
+    complete -c kytctl -n "__kytctl_at -b $command" -l client-version -x -d 'The client version'
+    complete -c kytctl -n "__kytctl_at -b $command" -l user-info -x -d 'A JSON object'
+    complete -c kytctl -n "__kytctl_at -b $command" -l require-user-info -d 'The session promises user information'
+end
+complete -c kytctl -n '__kytctl_at -b explain' -l batch -d 'The session batches its events'
+complete -c kytctl -n '__kytctl_at -b explain' -l session-info -x -d 'A JSON object'
+complete -c kytctl -n '__kytctl_at -b explain' -l client -x -d 'The name of the client'
+complete -c kytctl -n '__kytctl_at -b explain' -l service -x -d 'The name of the service'
+complete -c kytctl -n '__kytctl_at -b explain' -l single -d 'A single message'
+complete -c kytctl -n '__kytctl_at -b explain' -l storebag -r -F -d 'A storebag instead of the one of the server'
+complete -c kytctl -n '__kytctl_at -b explain' -l pid -x -a '(__fish_complete_pids)' -d 'The program, a process'
+complete -c kytctl -n '__kytctl_at -b explain' -l user -x -a '(__fish_complete_users)' -d 'Any process of a user'
+complete -c kytctl -n '__kytctl_at -b explain' -l draw -x -d 'The sampling draw, 0 to 1'
+complete -c kytctl -n '__kytctl_at -b explain' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at -b send' -l category -x -d 'The category of the event'
 complete -c kytctl -n '__kytctl_at -b send' -l type -x -d 'The type of the event'
 complete -c kytctl -n '__kytctl_at -b send' -l payload -x -d 'A JSON object'
-complete -c kytctl -n '__kytctl_at -b send' -l user-info -x -d 'A JSON object'
-complete -c kytctl -n '__kytctl_at -b send' -l require-user-info -d 'The session promises user information'
 complete -c kytctl -n '__kytctl_at session' -F
 complete -c kytctl -n '__kytctl_at -b defaults write' -l type -x -a 'string integer real boolean' -d 'What the value is'
 complete -c kytctl -n '__kytctl_due 1 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_domains)'
