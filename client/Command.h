@@ -22,6 +22,11 @@ struct Command {
   // Until when its completion waits for a daemon; none: for ever.
   std::optional<SteadyTime> deadline = std::nullopt;
 
+  // A message with an answer, and not one of the calls about the session.
+  [[nodiscard]] bool isMessage() const {
+    return call.method == Method::sendMessageWithDictionary ||
+           call.method == Method::sendMessageWithSessionInfo;
+  }
   // Whether the daemon gets it even if nobody waits for the answer any more: it says what the session is.
   [[nodiscard]] bool staysGiven() const;
 };

@@ -37,11 +37,8 @@ std::string fileURL(const std::string& path) {
   return url;
 }
 
-// False, and `answer` told, when a number is out of range.
-bool inRange(uint32_t category, uint32_t type, Answer& answer) {
-  if ((category | type) <= UINT16_MAX) return true;
-  answer.fail(ClientError::invalid, client::outOfRange(category, type));
-  return false;
+bool inRange(uint32_t category, uint32_t type) {
+  return (category | type) <= UINT16_MAX;
 }
 
 void chooseSocket(KYTReporting::Options& options) {
@@ -109,7 +106,10 @@ bool KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payl
 void KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                                ObjectCompletion completion) {
   Answer answer(std::move(completion));
-  if (!inRange(category, type, answer)) return;
+  if (!inRange(category, type)) {
+    implementation_->session->countInvalid();
+    return answer.fail(ClientError::invalid, client::outOfRange(category, type));
+  }
   client::MessageArguments message{static_cast<uint16_t>(category), static_cast<uint16_t>(type), flag,
                                    std::move(payload)};
   enqueue(command({Method::sendMessageWithDictionary, std::move(message), std::move(answer)}));
@@ -182,10 +182,19 @@ KYTReporting::Statistics KYTReporting::statistics() const {
   return implementation_->session->statistics();
 }
 
+KYTReporting::Statistics KYTReporting::totalStatistics() {
+  return client::Loop::current()->totals();
+}
+
 void KYTReporting::sendSingleMessage(Options options, uint32_t category, uint32_t type,
                                      std::optional<Dictionary> payload, TextCompletion completion) {
   Answer answer(std::move(completion));
-  if (!inRange(category, type, answer)) return;
+  if (!inRange(category, type)) {
+    Statistics refused;
+    refused.droppedInvalid = 1;
+    client::Loop::current()->addToTotals(refused);
+    return answer.fail(ClientError::invalid, client::outOfRange(category, type));
+  }
   options.onStateChange = nullptr;  // its context may be gone once the completion has run
   client::SingleMessageArguments message{options.sessionInfo, options.userInfo,
                                          static_cast<uint16_t>(category), static_cast<uint16_t>(type),

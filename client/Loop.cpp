@@ -68,6 +68,29 @@ void Loop::add(const std::shared_ptr<Session>& session) {
   if (ran) wakeUp_.wake();
 }
 
+void Loop::enroll(const Session& session) {
+  MutexLock lock(mutex_);
+  counted_.insert(&session);
+}
+
+void Loop::retire(const Session& session) {
+  MutexLock lock(mutex_);
+  counted_.erase(&session);
+  addTo(countedBefore_, session.statistics());
+}
+
+void Loop::addToTotals(const KYTReporting::Statistics& figures) {
+  MutexLock lock(mutex_);
+  addTo(countedBefore_, figures);
+}
+
+KYTReporting::Statistics Loop::totals() {
+  MutexLock lock(mutex_);
+  KYTReporting::Statistics sum = countedBefore_;
+  for (const Session* session : counted_) addTo(sum, session->statistics());
+  return sum;
+}
+
 void Loop::noticeWork() {
   std::atomic_thread_fence(std::memory_order_seq_cst);
   if (sleeping_.load(std::memory_order_relaxed) && sleeping_.exchange(false)) wakeUp_.wake();
@@ -108,10 +131,12 @@ milliseconds Loop::timeout(const Sessions& sessions, bool active) const {
 
 // Those that go on; with none of them the thread is to end.
 Loop::Sessions Loop::sessionsLeft() {
+  Sessions ended;  // what they own goes after the lock: that may be the last of it
   MutexLock lock(mutex_);
-  std::erase_if(sessions_, [](const auto& session) {
+  std::erase_if(sessions_, [&ended](auto& session) {
     libraryThread.assertCurrent();
-    return session->isDone();
+    if (session->isDone()) ended.push_back(std::move(session));
+    return session == nullptr;
   });
   if (sessions_.empty()) running_ = false;
   return sessions_;

@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <memory>
+#include <unordered_set>
 #include <vector>
 
 #include "client/Session.h"
@@ -23,6 +24,13 @@ class Loop {
 
   // The session ends at once where the system gives no thread; others that have one, or get one, do not.
   void add(const std::shared_ptr<Session>& session);
+  // A session's figures are part of the process's from its making to its end, and stay so. Any thread.
+  void enroll(const Session& session) EXCLUDES(mutex_);
+  void retire(const Session& session) EXCLUDES(mutex_);
+  // Of what was refused without a session.
+  void addToTotals(const KYTReporting::Statistics& figures) EXCLUDES(mutex_);
+  [[nodiscard]] KYTReporting::Statistics totals() EXCLUDES(mutex_);
+
   // After something was queued: wakes the thread only if it sleeps.
   void noticeWork();
   // Wakes it whatever it does: a session was closed.
@@ -49,6 +57,8 @@ class Loop {
   Mutex mutex_;
   Sessions sessions_ GUARDED_BY(mutex_);
   bool running_ GUARDED_BY(mutex_) = false;
+  std::unordered_set<const Session*> counted_ GUARDED_BY(mutex_);  // those that live
+  KYTReporting::Statistics countedBefore_ GUARDED_BY(mutex_);      // of those that do not
 };
 
 }  // namespace kyt::client

@@ -20,14 +20,17 @@ bool OutgoingQueue::pushMessage(MessageArguments&& message) {
   const auto bytes = static_cast<uint32_t>(std::min<size_t>(messageBytes(message.payload), UINT32_MAX));
   const size_t before = bytes_.fetch_add(bytes, std::memory_order_relaxed);
   if (before + bytes <= maxBytes_ && overflowed_.load(std::memory_order_relaxed) == 0 &&
-      ring_.push({std::move(message), bytes, nullptr}))
+      ring_.push({std::move(message), bytes, nullptr})) {
+    accepted_.fetch_add(1, std::memory_order_relaxed);
     return true;
+  }
   bytes_.fetch_sub(bytes, std::memory_order_relaxed);
   return false;
 }
 
 std::unique_ptr<Command> OutgoingQueue::pushCommand(std::unique_ptr<Command> command) {
   Item item;
+  const bool isMessage = command->isMessage();
   item.command = std::move(command);
   // NOLINTBEGIN(bugprone-use-after-move): push() leaves what it refuses.
   if (overflowed_.load() > 0 || !ring_.push(std::move(item))) {
@@ -37,6 +40,7 @@ std::unique_ptr<Command> OutgoingQueue::pushCommand(std::unique_ptr<Command> com
       overflowed_.fetch_add(1);
     }
   }
+  if (isMessage && !item.command) accepted_.fetch_add(1, std::memory_order_relaxed);
   commandQueued_.store(true);
   return std::move(item.command);
   // NOLINTEND(bugprone-use-after-move)
@@ -45,6 +49,7 @@ std::unique_ptr<Command> OutgoingQueue::pushCommand(std::unique_ptr<Command> com
 bool OutgoingQueue::pop(Item& item) {
   if (ring_.pop(item)) {
     bytes_.fetch_sub(item.bytes, std::memory_order_relaxed);
+    leaves(item);
     return true;
   }
   if (overflowed_.load() == 0) return false;
@@ -54,11 +59,16 @@ bool OutgoingQueue::pop(Item& item) {
   item.command = std::move(overflow_.front());
   overflow_.pop_front();
   overflowed_.fetch_sub(1);
+  leaves(item);
   return true;
 }
 
-std::vector<Answer> OutgoingQueue::takeExpired(SteadyTime now) {
-  std::vector<Answer> late;
+void OutgoingQueue::leaves(const Item& item) {
+  if (item.isMessage()) left_.fetch_add(1, std::memory_order_release);
+}
+
+OutgoingQueue::Expired OutgoingQueue::takeExpired(SteadyTime now) {
+  Expired late;
   if (!commandQueued_.exchange(false) && now < nextDeadline_) return late;
   nextDeadline_ = SteadyTime::max();
   const auto look = [&](const std::unique_ptr<Command>& command) {
@@ -70,11 +80,13 @@ std::vector<Answer> OutgoingQueue::takeExpired(SteadyTime now) {
     }
     command->deadline.reset();
     command->given = command->staysGiven();
-    late.push_back(std::exchange(command->call.answer, {}));
+    late.answers.push_back(std::exchange(command->call.answer, {}));
+    if (command->isMessage()) ++late.messages;
   };
   ring_.forEach([&look](const Item& item) { look(item.command); });
   MutexLock lock(mutex_);
   for (const auto& command : overflow_) look(command);
+  left_.fetch_add(late.messages, std::memory_order_release);
   return late;
 }
 

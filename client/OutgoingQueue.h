@@ -2,7 +2,7 @@
 // it when it is full, so that a program that floods the queue still gets its calls through, in order. Knows until
 // when the completions of the calls in it wait for a daemon.
 //
-// Threads: push…() and size() any thread, without a lock but for a call that finds the ring full; everything else the
+// Threads: push…(), accepted() and messages() any thread, without a lock but for a call that finds the ring full; everything else the
 // library's thread.
 #pragma once
 
@@ -28,6 +28,9 @@ class OutgoingQueue {
     MessageArguments message;
     uint32_t bytes = 0;  // what the message counts for
     std::unique_ptr<Command> command;
+
+    // Also a call with one, unless its time was over.
+    [[nodiscard]] bool isMessage() const { return !command || (command->isMessage() && command->given); }
   };
 
   // Room for so many items (64 to 65536, rounded up to a power of two) and so many bytes of messages (at least 4096).
@@ -39,8 +42,13 @@ class OutgoingQueue {
   [[nodiscard]] bool pushMessage(MessageArguments&& message);
   // Null when it was taken; the command itself when there is no room.
   [[nodiscard]] std::unique_ptr<Command> pushCommand(std::unique_ptr<Command> command);
-  // A snapshot, possibly stale.
-  [[nodiscard]] size_t size() const { return ring_.size() + overflowed_.load(std::memory_order_relaxed); }
+  // The messages that were taken since the beginning, alone and in calls; and those of them that are in the queue now and
+  // will be sent. Exact where nothing is in motion.
+  [[nodiscard]] uint64_t accepted() const { return accepted_.load(std::memory_order_relaxed); }
+  [[nodiscard]] uint64_t messages() const {
+    const uint64_t left = left_.load(std::memory_order_acquire), taken = accepted();
+    return taken > left ? taken - left : 0;  // one may leave before it is counted
+  }
 
   // The next in order; false: there is none.
   bool pop(Item& item) REQUIRES(libraryThread);
@@ -48,9 +56,13 @@ class OutgoingQueue {
     return ring_.empty() && overflowed_.load() == 0;
   }
 
+  struct Expired {
+    std::vector<Answer> answers;
+    uint64_t messages = 0;  // of those whose answers these are, and which are not sent any more
+  };
   // The completions whose deadline has passed while no daemon was there; their commands stay where they stand. Costs
   // nothing until a deadline is near or a call was queued.
-  [[nodiscard]] std::vector<Answer> takeExpired(SteadyTime now) REQUIRES(libraryThread);
+  [[nodiscard]] Expired takeExpired(SteadyTime now) REQUIRES(libraryThread);
   // A daemon is there: no deadline counts until lookAgain().
   void suspendDeadlines() REQUIRES(libraryThread) { commandQueued_.store(false); }
   void lookAgain() REQUIRES(libraryThread) { commandQueued_.store(true); }
@@ -65,12 +77,15 @@ class OutgoingQueue {
   // Any thread.
   MessageRing<Item> ring_;
   std::atomic<size_t> bytes_{0};
+  std::atomic<uint64_t> accepted_{0};
   std::atomic<size_t> overflowed_{0};
   std::atomic<bool> commandQueued_{false};  // since the deadlines were last looked at
   Mutex mutex_;
   std::deque<std::unique_ptr<Command>> overflow_ GUARDED_BY(mutex_);  // of commands that found the ring full
 
-  // The library's thread.
+  // The library's thread; `left_` is read by any.
+  void leaves(const Item& item) REQUIRES(libraryThread);
+  std::atomic<uint64_t> left_{0};  // of the accepted
   SteadyTime nextDeadline_ GUARDED_BY(libraryThread) = SteadyTime::max();
 };
 

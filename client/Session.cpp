@@ -43,26 +43,37 @@ Session::Session(KYTReporting::Options options, Loop* loop, bool single)
              std::move(options.frameworksToCheck), static_cast<bool>(options.aggregationBlock)}),
       aggregation_(std::move(options.aggregationBlock)),
       connection_(std::move(options.socketPath)) {
+  loop_->enroll(*this);
   if (problem_.empty()) return;
   closed_ = true;
   standing_.become(KYTReporting::State::refused, problem_);
 }
 
 Session::~Session() {
-  // Commands that were queued while the session ended.
+  // What was queued while the session ended.
+  for (Answer& answer : emptyQueue()) answer.fail(ClientError::closed, "the session is closed");
+  loop_->retire(*this);
+}
+
+// Counts its messages as lost; returns the answers of its calls.
+std::vector<Answer> Session::emptyQueue() {
+  std::vector<Answer> answers;
   OutgoingQueue::Item item;
-  while (queue_.pop(item))
-    if (item.command) item.command->call.answer.fail(ClientError::closed, "the session is closed");
+  while (queue_.pop(item)) {
+    if (item.isMessage()) figures_.lostInQueue.add();
+    if (item.command) answers.push_back(std::move(item.command->call.answer));
+  }
+  return answers;
 }
 
 bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payload, uint32_t flag) {
   if ((category | type) > UINT16_MAX) {
     standing_.say("message of " + outOfRange(category, type));
-    figures_.droppedInvalid.add();
+    countInvalid();
     return false;
   }
   if (refuses()) {
-    (problem_.empty() ? figures_.droppedClosed : figures_.droppedInvalid).add();
+    countRefusal();
     return false;
   }
   if (!queue_.pushMessage(
@@ -76,7 +87,9 @@ bool Session::enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payl
 }
 
 void Session::enqueueCommand(std::unique_ptr<Command> command) {
+  const bool isMessage = command->isMessage();
   if (refuses()) {
+    if (isMessage) countRefusal();
     const Error error = refusal();
     command->call.answer.fail(static_cast<ClientError>(error.code), error.localizedDescription);
     return;
@@ -85,8 +98,15 @@ void Session::enqueueCommand(std::unique_ptr<Command> command) {
       command->call.answer.isAwaited())
     command->deadline = Steady::now() + callDeadline_;
   command = queue_.pushCommand(std::move(command));
-  if (command) command->call.answer.fail(ClientError::queueFull, "the queue is full");
+  if (command) {
+    if (isMessage) figures_.droppedQueueFull.add();
+    command->call.answer.fail(ClientError::queueFull, "the queue is full");
+  }
   loop_->noticeWork();
+}
+
+void Session::countRefusal() {
+  (problem_.empty() ? figures_.droppedClosed : figures_.droppedInvalid).add();
 }
 
 Error Session::refusal() const {
@@ -96,7 +116,7 @@ Error Session::refusal() const {
 }
 
 KYTReporting::Statistics Session::statistics() const {
-  return figures_.statistics(queue_.size());
+  return figures_.statistics(queue_.accepted(), queue_.messages());
 }
 
 std::string Session::stateReason() const {
@@ -153,14 +173,8 @@ void Session::end(ClientError code, const std::string& reason) {
   connection_.close();
   // All is counted before anyone is told of the end.
   Unanswered::Left left = unanswered_.takeAll();
-  OutgoingQueue::Item item;
-  while (queue_.pop(item)) {
-    if (item.command)
-      left.answers.push_back(std::move(item.command->call.answer));
-    else
-      ++left.messages;
-  }
   figures_.lostOnConnectionEnd.add(left.messages);
+  for (Answer& answer : emptyQueue()) left.answers.push_back(std::move(answer));
   standing_.sayDrops(statistics());
   standing_.announce();
   standing_.dropBlock();
@@ -183,11 +197,12 @@ void Session::failAll(std::vector<Answer> answers, ClientError code, const std::
 // Completions that waited too long for a daemon get an error.
 void Session::expire(SteadyTime now) {
   if (connection_.isTaken()) return queue_.suspendDeadlines();
-  std::vector<Answer> late = queue_.takeExpired(now);
-  if (late.empty()) return;
-  figures_.waitedTooLong.add(late.size());
+  OutgoingQueue::Expired late = queue_.takeExpired(now);
+  if (late.answers.empty()) return;
+  figures_.waitedTooLong.add(late.answers.size());
+  figures_.droppedTooLate.add(late.messages);
   const std::string reason = "no daemon within " + secondsText(callDeadline_) + ": " + standing_.why();
-  failAll(std::move(late), ClientError::timedOut, reason);
+  failAll(std::move(late.answers), ClientError::timedOut, reason);
   // Nothing is left of it but a connection, which would keep the daemon from its idle end.
   if (single_) end(ClientError::timedOut, reason);
 }

@@ -56,6 +56,8 @@ class Session {
   void becomeInert();
   // There is no thread for it: the thread that opens it says so and ends it.
   void endUnserved();
+  // A message whose numbers are out of range.
+  void countInvalid() { figures_.droppedInvalid.add(); }
 
   // The library's thread: moves everything that can be moved now; whether anything was. False from isDone()
   // on.
@@ -81,11 +83,13 @@ class Session {
            saidGoodbye_.load(std::memory_order_relaxed);
   }
   [[nodiscard]] Error refusal() const;
+  void countRefusal();
   [[nodiscard]] bool ensureConnected(SteadyTime now) REQUIRES(libraryThread);
   void connect(SteadyTime now) REQUIRES(libraryThread);
   bool move(SteadyTime now) REQUIRES(libraryThread);
   void disconnected(SteadyTime now, std::string reason) REQUIRES(libraryThread);
   [[nodiscard]] bool givesUp() const REQUIRES(libraryThread);
+  [[nodiscard]] std::vector<Answer> emptyQueue() REQUIRES(libraryThread);
   void failAll(std::vector<Answer> answers, ClientError code, const std::string& reason)
       REQUIRES(libraryThread);
   void expire(SteadyTime now) REQUIRES(libraryThread);

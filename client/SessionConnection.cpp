@@ -103,7 +103,8 @@ void Session::disconnected(SteadyTime now, std::string reason) {
 bool Session::drain() {
   bool any = false;
   OutgoingQueue::Item item;
-  while (output_.waiting() < kWriteAhead && !ending_ && queue_.pop(item)) {
+  while (output_.waiting() < kWriteAhead && unanswered_.messages() < KYTReporting::kMostUnacknowledged &&
+         !ending_ && queue_.pop(item)) {
     any = true;
     if (item.command)
       drainCommand(std::move(item.command));
@@ -118,10 +119,10 @@ void Session::drainMessage(const MessageArguments& message) {
   if (!serial) {
     standing_.say("message of category " + std::to_string(message.category) + ", type " +
                   std::to_string(message.type) + ": larger than a megabyte, or nested too deeply");
-    figures_.droppedInvalid.add();
+    figures_.droppedUnsendable.add();
     return;
   }
-  figures_.sent.add();
+  figures_.written.add();
   if (!kept_.isConfigured() && figures_.sentUnconfigured.add() == 0)
     standing_.become(State::connected,
                      "messages are sent, and startConfiguration was not called: the daemon drops them");
@@ -134,10 +135,11 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
   if (call.method == Method::finishSessionGracefully) ending_ = true;
   const std::optional<uint32_t> serial = output_.call(call, connection_.passesDescriptors());
   if (!serial) {
-    figures_.droppedInvalid.add();
+    (command->isMessage() ? figures_.droppedUnsendable : figures_.droppedInvalid).add();
     call.answer.fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
     return;
   }
+  if (command->isMessage()) figures_.written.add();
   kept_.takeOver(call);
   if (call.method == Method::startConfigWithCompletionHandler && standing_.state() == State::connected)
     standing_.note(State::connected, reasonOfConnected(true));

@@ -3,6 +3,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "client/Figures.h"
 #include "platform/base/TextEscape.h"
 #include "platform/linux/client/ClientSocket.h"
 
@@ -57,19 +58,14 @@ void Standing::say(const std::string& text) const {
 
 void Standing::sayDrops(const KYTReporting::Statistics& figures) {
   if (!debugs_) return;
-  const auto compare = [this](uint64_t now, uint64_t& before, const char* reason) {
+  for (const NamedFigure& loss : kLosses) {
+    const uint64_t now = figures.*loss.figure;
+    uint64_t& before = said_.*loss.figure;
     if (now > before)
-      say("dropped " + std::to_string(now - before) + ": " + reason + " (" + std::to_string(now) +
+      say("dropped " + std::to_string(now - before) + ": " + loss.reason + " (" + std::to_string(now) +
           " in all)");
     before = now;
-  };
-  compare(figures.droppedQueueFull, said_.droppedQueueFull, "queue-full");
-  compare(figures.lostOnConnectionEnd, said_.lostOnConnectionEnd, "connection-ended");
-  compare(figures.droppedClosed, said_.droppedClosed, "session-closed");
-  compare(figures.droppedInvalid, said_.droppedInvalid, "invalid");
-  compare(figures.waitedTooLong, said_.waitedTooLong, "waited-too-long");
-  compare(figures.replayFailed, said_.replayFailed, "replay-failed");
-  compare(figures.sentUnconfigured, said_.sentUnconfigured, "not-configured");
+  }
 }
 
 }  // namespace kyt::client

@@ -19,7 +19,11 @@ class Unanswered {
   void addCall(uint32_t serial, std::unique_ptr<Command> command);
   void addPing(uint32_t serial, SteadyTime now);
 
-  // When a ping is due, four a second at most; none: no message waits for one, or one is on its way.
+  // How many messages nothing has acknowledged; calls do not count.
+  [[nodiscard]] uint64_t messages() const { return unacknowledged_; }
+
+  // When a ping is due, four a second at most, or as soon as many messages wait for one; none: no message does, or one is
+  // on its way.
   [[nodiscard]] std::optional<SteadyTime> nextPing() const;
 
   // A reply came: it acknowledges the messages before it. Returns the call that it answers; none for a ping, and for what
@@ -28,7 +32,7 @@ class Unanswered {
 
   // The connection has ended: what was sent in vain.
   struct Left {
-    uint64_t messages = 0;
+    uint64_t messages = 0;  // those in calls included
     std::vector<Answer> answers;
   };
   [[nodiscard]] Left takeAll();
@@ -46,6 +50,7 @@ class Unanswered {
 
   std::deque<Pending> calls_;
   std::deque<Messages> messages_;
+  uint64_t unacknowledged_ = 0;  // the sum of messages_
   std::optional<uint32_t> ping_;
   SteadyTime lastPing_{};
 };

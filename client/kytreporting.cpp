@@ -41,6 +41,23 @@ std::optional<Dictionary> optional(const kyt_dictionary* dictionary) {
   return dictionary->value;
 }
 
+kyt_statistics inC(const KYTReporting::Statistics& figures) {
+  return {figures.sent,
+          figures.droppedQueueFull,
+          figures.lostOnConnectionEnd,
+          figures.droppedClosed,
+          figures.droppedInvalid,
+          figures.connections,
+          figures.queued,
+          figures.waitedTooLong,
+          figures.replayFailed,
+          figures.sentUnconfigured,
+          figures.accepted,
+          figures.lostInQueue,
+          figures.droppedUnsendable,
+          figures.droppedTooLate};
+}
+
 KYTReporting::Options optionsOf(const kyt_options& given) {
   kyt_options known{};
   // Whole fields alone: half a pointer points nowhere.
@@ -292,18 +309,10 @@ void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t 
                                      algorithm);
 }
 void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics) {
-  if (session == nullptr || statistics == nullptr) return;
-  const KYTReporting::Statistics figures = session->reporting->statistics();
-  *statistics = {figures.sent,
-                 figures.droppedQueueFull,
-                 figures.lostOnConnectionEnd,
-                 figures.droppedClosed,
-                 figures.droppedInvalid,
-                 figures.connections,
-                 figures.queued,
-                 figures.waitedTooLong,
-                 figures.replayFailed,
-                 figures.sentUnconfigured};
+  if (session != nullptr && statistics != nullptr) *statistics = inC(session->reporting->statistics());
+}
+void kyt_total_statistics(kyt_statistics* statistics) {
+  if (statistics != nullptr) *statistics = inC(KYTReporting::totalStatistics());
 }
 void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, kyt_text_callback callback, void* context) {

@@ -34,7 +34,7 @@ int main(int argc, char** argv) {
   const bool all = session->finish();
   const auto figures = session->statistics();
   std::printf("sent %llu, lost %llu\n", static_cast<unsigned long long>(figures.sent),
-              static_cast<unsigned long long>(figures.lostOnConnectionEnd));
+              static_cast<unsigned long long>(figures.accepted - figures.sent));
   if (!all) std::fprintf(stderr, "not all was sent: %s\n", session->stateReason().c_str());
   return all ? 0 : 1;
 }

@@ -163,7 +163,8 @@ TEST_F(KYTReportingTest, CountsAMessageThatIsTooLargeToBeSentAndGoesOn) {
   EXPECT_TRUE(session->sendMessage(2, 1, {}));
   EXPECT_TRUE(eventually([&] { return daemon_.count("Send 2") == 1; }));
   EXPECT_EQ(daemon_.count("Send 1"), 0u);
-  EXPECT_EQ(session->statistics().droppedInvalid, 1u);
+  EXPECT_EQ(session->statistics().droppedUnsendable, 1u);
+  EXPECT_EQ(session->statistics().droppedInvalid, 0u);
 }
 
 TEST_F(KYTReportingTest, GivesTheAnswersOfTheDaemonToTheCompletions) {

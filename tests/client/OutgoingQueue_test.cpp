@@ -45,7 +45,7 @@ TEST(OutgoingQueue, KeepsMessagesAndCallsInOrder) {
   EXPECT_TRUE(queue.pushMessage(message(1)));
   EXPECT_EQ(queue.pushCommand(command(Method::fetchDisplayURL)), nullptr);
   EXPECT_TRUE(queue.pushMessage(message(2)));
-  EXPECT_EQ(queue.size(), 3U);
+  EXPECT_EQ(queue.messages(), 2U);
   EXPECT_FALSE(queue.isEmpty());
   EXPECT_EQ(popAll(queue), (std::vector<std::string>{"1", "FetchDisplayURL", "2"}));
   EXPECT_TRUE(queue.isEmpty());
@@ -56,7 +56,7 @@ TEST(OutgoingQueue, RefusesMessagesBeyondItsNumber) {
   OutgoingQueue queue(64, 1 << 20);
   for (uint16_t i = 0; i < 64; ++i) EXPECT_TRUE(queue.pushMessage(message(i)));
   EXPECT_FALSE(queue.pushMessage(message(64)));
-  EXPECT_EQ(queue.size(), 64U);
+  EXPECT_EQ(queue.messages(), 64U);
   OutgoingQueue::Item item;
   ASSERT_TRUE(queue.pop(item));
   EXPECT_TRUE(queue.pushMessage(message(65)));
@@ -99,7 +99,7 @@ TEST(OutgoingQueue, GivesBackACallWhenThereIsNoMoreRoomForCalls) {
   for (; taken < 10000 && !refused; ++taken)
     refused = queue.pushCommand(command(Method::flushMessagesWithCompletion, &failure));
   ASSERT_NE(refused, nullptr);
-  EXPECT_EQ(queue.size(), taken - 1);
+  EXPECT_EQ(popAll(queue).size(), taken - 1);
   refused->call.answer.fail(ClientError::queueFull, "full");
   EXPECT_EQ(failure, "full");
 }
@@ -118,14 +118,14 @@ TEST(OutgoingQueue, TakesTheCompletionsWhoseDeadlineHasPassed) {
   EXPECT_EQ(queue.pushCommand(command(Method::fetchDisplayURL, &never)), nullptr);
   EXPECT_TRUE(queue.hasNewCommand());
 
-  std::vector<Answer> expired = queue.takeExpired(kNow);
+  std::vector<Answer> expired = queue.takeExpired(kNow).answers;
   ASSERT_EQ(expired.size(), 1U);
   expired[0].fail(ClientError::timedOut, "late");
   EXPECT_EQ(flush, "late");
   EXPECT_FALSE(queue.hasNewCommand());
   EXPECT_EQ(queue.nextDeadline(), kNow + seconds(5));
-  EXPECT_TRUE(queue.takeExpired(kNow + seconds(4)).empty());
-  EXPECT_EQ(queue.takeExpired(kNow + seconds(5)).size(), 1U);
+  EXPECT_TRUE(queue.takeExpired(kNow + seconds(4)).answers.empty());
+  EXPECT_EQ(queue.takeExpired(kNow + seconds(5)).answers.size(), 1U);
   EXPECT_EQ(queue.nextDeadline(), SteadyTime::max());
   EXPECT_EQ(never, "waits");
 }
@@ -155,9 +155,9 @@ TEST(OutgoingQueue, LooksAtNoDeadlineWhileTheyAreSuspended) {
   EXPECT_EQ(queue.pushCommand(std::move(late)), nullptr);
   queue.suspendDeadlines();
   EXPECT_FALSE(queue.hasNewCommand());
-  EXPECT_TRUE(queue.takeExpired(kNow).empty());
+  EXPECT_TRUE(queue.takeExpired(kNow).answers.empty());
   queue.lookAgain();
-  EXPECT_EQ(queue.takeExpired(kNow).size(), 1U);
+  EXPECT_EQ(queue.takeExpired(kNow).answers.size(), 1U);
 }
 
 TEST(OutgoingQueue, LosesAndReordersNothingOfManyThreads) {
@@ -195,20 +195,60 @@ TEST(OutgoingQueue, LosesAndReordersNothingOfManyThreads) {
   EXPECT_TRUE(queue.isEmpty());
 }
 
+TEST(OutgoingQueue, CountsMessagesAndNoCalls) {
+  OutgoingQueue queue(64, 4096);
+  libraryThread.assertCurrent();
+  const auto call = [](Method method, bool expires) {
+    auto made = std::make_unique<Command>(Call{method});
+    if (expires) made->deadline = SteadyTime(std::chrono::seconds(1));
+    return made;
+  };
+  EXPECT_TRUE(queue.pushMessage({1, 1, 0, {}}));
+  EXPECT_EQ(queue.pushCommand(call(Method::flushMessagesWithCompletion, false)), nullptr);
+  EXPECT_EQ(queue.pushCommand(call(Method::sendMessageWithDictionary, false)), nullptr);
+  EXPECT_EQ(queue.pushCommand(call(Method::sendMessageWithDictionary, true)), nullptr);
+  EXPECT_EQ(queue.accepted(), 3U);
+  EXPECT_EQ(queue.messages(), 3U);
+  const OutgoingQueue::Expired late = queue.takeExpired(SteadyTime(std::chrono::seconds(2)));
+  EXPECT_EQ(late.messages, 1U);
+  EXPECT_EQ(queue.messages(), 2U) << "the one that is too late is not sent";
+  OutgoingQueue::Item item;
+  while (queue.pop(item)) {
+  }
+  EXPECT_EQ(queue.messages(), 0U);
+  EXPECT_EQ(queue.accepted(), 3U);
+}
+
 TEST(Figures, AreTheStatisticsOfTheirNames) {
   Figures figures;
-  Figure* const all[] = {&figures.sent,          &figures.droppedQueueFull, &figures.lostOnConnectionEnd,
-                         &figures.droppedClosed, &figures.droppedInvalid,   &figures.connections,
-                         &figures.waitedTooLong, &figures.replayFailed,     &figures.sentUnconfigured};
+  Figure* const all[] = {&figures.written,       &figures.droppedQueueFull,  &figures.lostOnConnectionEnd,
+                         &figures.droppedClosed, &figures.droppedInvalid,    &figures.connections,
+                         &figures.waitedTooLong, &figures.replayFailed,      &figures.sentUnconfigured,
+                         &figures.lostInQueue,   &figures.droppedUnsendable, &figures.droppedTooLate};
   uint64_t count = 0;
   for (Figure* figure : all) figure->add(++count);
-  EXPECT_EQ(figures.sent.add(), 1U) << "the figure before";
-  const KYTReporting::Statistics told = figures.statistics(10);
+  EXPECT_EQ(figures.written.add(100), 1U) << "the figure before";
+  const KYTReporting::Statistics told = figures.statistics(20, 10);
   EXPECT_EQ(
       (std::vector<uint64_t>{told.sent, told.droppedQueueFull, told.lostOnConnectionEnd, told.droppedClosed,
                              told.droppedInvalid, told.connections, told.waitedTooLong, told.replayFailed,
-                             told.sentUnconfigured, told.queued}),
-      (std::vector<uint64_t>{2, 2, 3, 4, 5, 6, 7, 8, 9, 10}));
+                             told.sentUnconfigured, told.lostInQueue, told.droppedUnsendable,
+                             told.droppedTooLate, told.queued, told.accepted}),
+      (std::vector<uint64_t>{98, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 10, 20}));
+}
+
+TEST(Figures, AreAllAddedUp) {
+  constexpr size_t kFigures = sizeof(KYTReporting::Statistics) / sizeof(uint64_t);
+  EXPECT_EQ(std::size(kLosses) + std::size(kOtherFigures), kFigures);
+  KYTReporting::Statistics one, sum;
+  uint64_t count = 0;
+  for (const NamedFigure& loss : kLosses) one.*loss.figure = ++count;
+  for (const auto figure : kOtherFigures) one.*figure = ++count;
+  EXPECT_EQ(count, kFigures);
+  addTo(sum, one);
+  addTo(sum, one);
+  for (const NamedFigure& loss : kLosses) EXPECT_EQ(sum.*loss.figure, 2 * (one.*loss.figure)) << loss.reason;
+  for (const auto figure : kOtherFigures) EXPECT_EQ(sum.*figure, 2 * (one.*figure));
 }
 
 }  // namespace

@@ -46,6 +46,34 @@ TEST(Unanswered, CountsAllMessagesWhenAReplyCameToNothingOfItsOwn) {
   EXPECT_EQ(sent.takeAll().messages, 1U);
 }
 
+TEST(Unanswered, CountsAMessageWithAnAnswerThatDoesNotComeAndNoOtherCall) {
+  Unanswered sent;
+  sent.addCall(1, command(Method::sendMessageWithDictionary));
+  sent.addCall(2, command(Method::sendMessageWithSessionInfo));
+  sent.addCall(3, command(Method::flushMessagesWithCompletion));
+  sent.addMessage(4);
+  EXPECT_EQ(sent.messages(), 1U) << "calls are told of their end";
+  const Unanswered::Left left = sent.takeAll();
+  EXPECT_EQ(left.messages, 3U);
+  EXPECT_EQ(left.answers.size(), 3U);
+  EXPECT_EQ(sent.messages(), 0U);
+}
+
+TEST(Unanswered, AsksForAPingAtOnceWhenManyMessagesWait) {
+  Unanswered sent;
+  uint32_t serial = 0;
+  sent.addMessage(++serial);
+  sent.addPing(++serial, kNow);
+  EXPECT_EQ(sent.take(serial), nullptr);
+  EXPECT_EQ(sent.messages(), 0U);
+  for (uint64_t i = 1; i < KYTReporting::kMostUnacknowledged / 4; ++i) sent.addMessage(++serial);
+  EXPECT_EQ(sent.nextPing(), kNow + milliseconds(250));
+  sent.addMessage(++serial);
+  EXPECT_EQ(sent.nextPing(), kNow);
+  sent.addPing(++serial, kNow);
+  EXPECT_EQ(sent.nextPing(), std::nullopt);
+}
+
 TEST(Unanswered, AcknowledgesWhereSerialsBeginAgain) {
   Unanswered sent;
   sent.addMessage(UINT32_MAX);

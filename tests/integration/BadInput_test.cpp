@@ -84,7 +84,10 @@ class SteadyClient {
   }
   [[nodiscard]] bool finished() const { return finished_; }
   [[nodiscard]] const std::string& problem() const { return problem_; }
-  [[nodiscard]] uint64_t lost() { return client_->statistics().lostOnConnectionEnd; }
+  [[nodiscard]] uint64_t lost() {
+    const KYTReporting::Statistics figures = client_->statistics();
+    return figures.accepted - figures.sent;
+  }
 
  private:
   void run() {

@@ -74,8 +74,9 @@ class Books {
  public:
   void add(const KYTReporting::Statistics& statistics) {
     sent_ += statistics.sent;
-    lost_ += statistics.lostOnConnectionEnd;
-    dropped_ += statistics.droppedQueueFull + statistics.droppedClosed + statistics.droppedInvalid;
+    lost_ += statistics.lostOnConnectionEnd + statistics.lostInQueue;
+    dropped_ += statistics.droppedQueueFull + statistics.droppedClosed + statistics.droppedInvalid +
+                statistics.droppedUnsendable + statistics.droppedTooLate;
     if (statistics.connections > 1) reconnected_ += statistics.connections - 1;
   }
   void addLatency(Clock::duration duration) { latencies_.push_back(duration); }

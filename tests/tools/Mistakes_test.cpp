@@ -256,7 +256,7 @@ TEST_F(Mistakes, APayloadThatIsTooLargeIsToldByTheLibrarysFigures) {
   ASSERT_EQ(client.configure(), "live: httppost");
   client.send(3, 4, {{"text", std::string(1 << 20, 'x')}});
   EXPECT_TRUE(client.finish());
-  EXPECT_EQ(client->statistics().droppedInvalid, 1U);
+  EXPECT_EQ(client->statistics().droppedUnsendable, 1U);
 }
 
 TEST_F(Mistakes, TextThatIsNoUTF8ArrivesWithReplacements) {
@@ -269,7 +269,7 @@ TEST_F(Mistakes, TextThatIsNoUTF8ArrivesWithReplacements) {
   const Dictionary record = onlyRecord("method=3");
   EXPECT_EQ(record.find("text") != nullptr ? *record.find("text") : Value(), Value("caf\uFFFD"));
   EXPECT_EQ(record.find("k\uFFFDy") != nullptr ? *record.find("k\uFFFDy") : Value(), Value("whole"));
-  EXPECT_EQ(client->statistics().droppedInvalid, 0U) << "nothing was dropped";
+  EXPECT_EQ(client->statistics().droppedUnsendable, 0U) << "nothing was dropped";
   EXPECT_EQ(causeOf("the record arrives with U+FFFD"), "text that is no UTF-8");
 }
 
@@ -283,6 +283,7 @@ TEST_F(Mistakes, ASessionThatIsClosedWithoutFinishIsToldByDebugLines) {
     EXPECT_EQ(client.configure(), "live: httppost");
     stage_->daemon()->signal(SIGSTOP);
     for (int i = 0; i < 10; ++i) EXPECT_TRUE(client.send(3, 4, {}));
+    EXPECT_TRUE(eventually([&] { return client->statistics().sent == 10; })) << "written";
   }
   stage_->daemon()->signal(SIGCONT);
   const std::string lines = testing::internal::GetCapturedStderr();
@@ -291,7 +292,7 @@ TEST_F(Mistakes, ASessionThatIsClosedWithoutFinishIsToldByDebugLines) {
             std::string::npos)
       << lines;
   EXPECT_EQ(causeOf("`kytctl session`: “the script ends without ”; a program's debug lines "
-                    "(`KYTREPORTING_DEBUG=1`): “connection-ended”"),
+                    "(`KYTREPORTING_DEBUG=1`): “connection-ended” or “session-ended”"),
             "the session was closed without `finish`");
 }
 

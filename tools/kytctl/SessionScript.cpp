@@ -135,7 +135,6 @@ int SessionScript::open(const Dictionary& step) {
     refusal->become(state, why);
   };
   session_ = KYTReporting::open(std::move(options));
-  answered_ = 0;
   configured_ = false;
   return 0;
 }
@@ -198,9 +197,7 @@ int SessionScript::sendWithReply(uint16_t category, uint16_t type, const Diction
                         [answer](const Value& value, std::optional<Error> error) {
                           answer->set(value.isNull() ? "" : description(value), std::move(error));
                         });
-  const int status = reportCall(answer, "send");
-  if (status == 0) ++answered_;
-  return status;
+  return reportCall(answer, "send");
 }
 
 // A script that repeats a message more often than the session's queue holds goes on at the daemon's pace.
@@ -249,10 +246,10 @@ int SessionScript::finish(const Dictionary&) {
   const bool done = session_->finish(timeout);
   unfinished_ = false;
   const KYTReporting::Statistics figures = session_->statistics();
-  std::printf("sent %llu, lost %llu, dropped %llu\n",
-              static_cast<unsigned long long>(figures.sent + answered_),
-              static_cast<unsigned long long>(figures.lostOnConnectionEnd),
-              static_cast<unsigned long long>(figures.droppedQueueFull + figures.droppedInvalid));
+  std::printf("sent %llu, lost %llu, dropped %llu\n", static_cast<unsigned long long>(figures.sent),
+              static_cast<unsigned long long>(figures.lostOnConnectionEnd + figures.lostInQueue),
+              static_cast<unsigned long long>(figures.droppedQueueFull + figures.droppedInvalid +
+                                              figures.droppedUnsendable + figures.droppedTooLate));
   const char* const late = "the daemon did not take everything in time";
   return done ? 0 : failedCall(connection_, "finish", refusal_->why().value_or(late));
 }

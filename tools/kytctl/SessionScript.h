@@ -50,7 +50,6 @@ class SessionScript {
   const std::map<std::string, Step> steps_;
   const std::shared_ptr<Aggregated> aggregated_;  // also the library's thread's
   std::shared_ptr<Refusal> refusal_;              // of the session; likewise
-  uint64_t answered_ = 0;                         // messages that were sent with a reply, and got one
   bool configured_ = false;                       // what is sent before is dropped by the daemon
   bool unfinished_ = false;                       // the daemon may not have taken what was sent
   std::unique_ptr<KYTReporting> session_;

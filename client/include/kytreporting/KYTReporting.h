@@ -136,19 +136,35 @@ class KYT_EXPORT KYTReporting {
     bool finishWaitsForDaemon = false;
   };
 
+  // Where a session's messages are, and what else happened to it. A message is what sendMessage(), in both forms, and
+  // sendSingleMessage() are given; flushes, uploads and other calls are none. Always, unless something is in motion:
+  //   accepted = sent + queued + lostOnConnectionEnd + lostInQueue + droppedUnsendable + droppedTooLate
+  // and what was refused (droppedQueueFull, droppedClosed, droppedInvalid) was not accepted: each is counted once.
   struct Statistics {
-    uint64_t sent = 0;              // messages written to the daemon's socket
+    // Messages written to the daemon's socket, and not lost with their connection: taken by the daemon, or about to be.
+    // Becomes less by what lostOnConnectionEnd becomes more.
+    uint64_t sent = 0;
     uint64_t droppedQueueFull = 0;  // refused by sendMessage because the queue was full
-    // Written or queued, but their connection ended before the daemon took them.
+    // Written, but their connection ended before the daemon is known to have taken them: it took between none and all.
+    // What one end loses is bounded: kMostUnacknowledged messages, and those whose completion then gets an error.
     uint64_t lostOnConnectionEnd = 0;
-    uint64_t droppedClosed = 0;     // sent after close, or in a child process
-    uint64_t droppedInvalid = 0;    // could not be encoded, or their session's information is wrong
-    uint64_t connections = 0;       // connections made, the first included
-    uint64_t queued = 0;            // in the queue now
-    uint64_t waitedTooLong = 0;     // calls whose completion waited for a daemon until the deadline
-    uint64_t replayFailed = 0;      // values that a daemon that came back could not be told again
-    uint64_t sentUnconfigured = 0;  // sent before startConfiguration: the daemon dropped them
+    uint64_t droppedClosed = 0;  // refused: sent after close, or in a child process
+    uint64_t droppedInvalid =
+        0;  // refused: numbers out of range, or their session's information is wrong; and calls
+            // that are no messages and could not be encoded
+    uint64_t connections = 0;  // connections made, the first included
+    uint64_t queued = 0;       // messages in the queue now
+    uint64_t waitedTooLong =
+        0;  // calls, messages or not, whose completion waited for a daemon until the deadline
+    uint64_t replayFailed = 0;       // values that a daemon that came back could not be told again
+    uint64_t sentUnconfigured = 0;   // sent before startConfiguration: the daemon dropped them
+    uint64_t accepted = 0;           // messages that were not refused
+    uint64_t lostInQueue = 0;        // still in the queue when the session ended
+    uint64_t droppedUnsendable = 0;  // larger than a megabyte, or nested too deeply
+    uint64_t droppedTooLate = 0;     // no daemon took them within Options::callDeadline
   };
+  // The library has at most so many messages without a completion under way that the daemon has not acknowledged.
+  static constexpr uint64_t kMostUnacknowledged = 16384;
 
   // What is wrong with a session's information: a key that there is not, or a value of another type or out of
   // range. The description names the key; none when all is right. The daemon would take such an entry as
@@ -203,6 +219,10 @@ class KYT_EXPORT KYTReporting {
   bool finish(std::chrono::milliseconds timeout = std::chrono::seconds(5));
 
   [[nodiscard]] Statistics statistics() const;
+  // The sums over all sessions of this process, ended ones and single messages included; `queued` is of those that live.
+  // Any thread; visits every living session under a lock that opening and closing a session take too, messages do not. In a
+  // child made by fork() they begin at zero, and the parent's sessions do not count.
+  [[nodiscard]] static Statistics totalStatistics();
   // Where the session stands now, and why. After its end: where it stood. In a child process made by fork() the
   // state is the parent's of that moment.
   [[nodiscard]] State state() const;

@@ -156,11 +156,33 @@ KYT_API void kyt_session_upload_file(kyt_session* session, const char* path, kyt
 KYT_API void kyt_session_upload_log_data(kyt_session* session, const kyt_array* log_data,
                                          kyt_success_callback callback, void* context);
 
+/* Where a session's messages are, and what else happened to it. Always, unless something is in motion:
+ *   accepted = sent + queued + lost_on_connection_end + lost_in_queue + dropped_unsendable + dropped_too_late
+ * and what was refused (dropped_queue_full, dropped_closed, dropped_invalid) was not accepted. */
 typedef struct kyt_statistics {
-  uint64_t sent, dropped_queue_full, lost_on_connection_end, dropped_closed, dropped_invalid, connections,
-      queued, waited_too_long, replay_failed, sent_unconfigured;
+  uint64_t sent;               /* written to the daemon's socket, and not lost with their connection */
+  uint64_t dropped_queue_full; /* refused: the queue was full */
+  uint64_t
+      lost_on_connection_end; /* written; their connection ended before the daemon is known to have taken them */
+  uint64_t dropped_closed;    /* refused: after the end, or in a child process */
+  uint64_t
+      dropped_invalid; /* refused: numbers out of range, wrong session information; and other calls that could
+                                    * not be encoded */
+  uint64_t connections; /* connections made, the first included */
+  uint64_t queued;      /* in the queue now */
+  uint64_t
+      waited_too_long;    /* calls, messages or not, whose callback waited for a daemon until the deadline */
+  uint64_t replay_failed; /* values that a daemon that came back could not be told again */
+  uint64_t sent_unconfigured;  /* sent before the configuration: the daemon dropped them */
+  uint64_t accepted;           /* messages that were not refused */
+  uint64_t lost_in_queue;      /* still in the queue when the session ended */
+  uint64_t dropped_unsendable; /* larger than a megabyte, or nested too deeply */
+  uint64_t dropped_too_late;   /* no daemon took them within the call deadline */
 } kyt_statistics;
 KYT_API void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics);
+/* The sums over all sessions of this process, ended ones and single messages included. In a child made by fork() they
+ * begin at zero, and the parent's sessions do not count. */
+KYT_API void kyt_total_statistics(kyt_statistics* statistics);
 
 /* One event without a session of its own; the callback gets "finished", or what went wrong: null options too. */
 KYT_API void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
