@@ -98,8 +98,8 @@ Dictionary TomlUserDefaults::values(std::string_view domain) {
 }
 
 std::optional<Error> TomlUserDefaults::set(std::string_view domain, std::string_view key, Value value) {
-  const BlockingScope blocking;
   const GateLock lock(writing_);
+  const BlockingScope blocking;
   auto result = store(domain, key, std::move(value), Mode::replace);
   if (auto* error = std::get_if<Error>(&result)) return std::move(*error);
   return std::nullopt;
@@ -109,8 +109,8 @@ String TomlUserDefaults::stringOrStore(std::string_view domain, std::string_view
                                        std::optional<uint32_t> owner) {
   const Value known = this->value(domain, key);
   if (known.string() != nullptr) return *known.string();
-  const BlockingScope blocking;
   const GateLock lock(writing_);
+  const BlockingScope blocking;
   auto result = store(domain, key, Value(value), Mode::keepString, owner);
   if (const auto* error = std::get_if<Error>(&result)) {
     if (counters_.addAndMayLog(Reason::customIdentifierRefused, clock_.monotonic())) {

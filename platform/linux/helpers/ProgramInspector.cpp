@@ -103,8 +103,8 @@ std::variant<std::unique_ptr<ProgramInspectorProcess>, std::string> ProgramInspe
 }
 
 Answer ProgramInspectorProcess::ask(int32_t pid) {
-  const BlockingScope blocking;
   const GateLock lock(asking_);
+  const BlockingScope blocking;
   Answer failed;
   failed.error = ETIMEDOUT;
   // Each question has one answer, in order. While those of earlier ones are missing the helper stands still; who waited

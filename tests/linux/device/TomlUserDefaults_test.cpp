@@ -341,6 +341,40 @@ TEST_F(TomlUserDefaultsTest, ALockThatSomebodyKeepsIsWaitedForOnceByAllAndHoldsU
   pool.shutDown();
 }
 
+// They counted as blocked only, of which one user may have half of all.
+TEST_F(TomlUserDefaultsTest, WritersInLineOfOneUserTakeAFifthOfTheWorkersAtMost) {
+  constexpr size_t kWorkers = 40, kWriters = 60;
+  folder_.write("com.vantu.kytreporting.lock", "");
+  const Descriptor held =
+      ownDescriptor(::open((folder_ / "com.vantu.kytreporting.lock").c_str(), O_RDONLY | O_CLOEXEC));
+  ASSERT_EQ(::flock(held.get(), LOCK_EX), 0);
+  auto defaults = make(std::chrono::seconds(60));
+  WorkerPool pool({.runnable = 2, .maxWorkers = kWorkers});
+  std::atomic<size_t> finished{0};
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  for (size_t i = 0; i < kWriters; ++i) {
+    queues.push_back(SerialQueue::create("test.writer", pool, 1001));
+    queues.back()->async([&, i] {
+      if (i % 2 == 0) {
+        EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("x")), "x");
+      } else {
+        EXPECT_EQ(defaults.set(kDomain, "none", Value()), std::nullopt);
+      }
+      ++finished;
+    });
+  }
+  WorkerPoolFigures figures;
+  ASSERT_TRUE(eventually([&] {
+    figures = pool.figures();
+    return figures.blocked > 2 && figures.blocked + figures.idle == figures.workers &&
+           figures.blocked + figures.waitingQueues == kWriters;
+  })) << "all that may wait do";
+  EXPECT_LE(figures.blocked, kWorkers / 5 + 3) << "the one that writes, and two that were about to wait";
+  ASSERT_EQ(::flock(held.get(), LOCK_UN), 0);
+  ASSERT_TRUE(eventually([&] { return finished == kWriters; }));
+  pool.shutDown();
+}
+
 TEST_F(TomlUserDefaultsTest, ACrashAtAnyStepLeavesTheOldOrTheNewContent) {
   for (const char* step : {"locked", "created", "written", "synced", "renamed", "done"}) {
     folder_.write(kFile, "a = \"old\"\n");

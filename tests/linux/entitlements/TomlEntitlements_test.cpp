@@ -22,6 +22,8 @@
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/objects/Keys.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/WorkerPool.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/NoDescriptors.h"
@@ -446,6 +448,45 @@ TEST(ProgramInspectorProcess, ThatStandsStillIsWaitedForOnceAndAnswersWhenItGoes
     EXPECT_TRUE(eventually([&] { return inspector.runningProgram(::getpid()).index() == 0; }));
     EXPECT_EQ(std::get<int>(inspector.runningProgram(INT32_MAX)), ESRCH) << "the answer of another question";
   }
+}
+
+// They counted as blocked only, of which one user may have half of all.
+TEST(ProgramInspectorProcess, ThoseInLineForItOfOneUserTakeAFifthOfTheWorkersAtMost) {
+  constexpr size_t kWorkers = 40, kQuestions = 60;
+  auto started = ProgramInspectorProcess::start();
+  ASSERT_EQ(started.index(), 0u);
+  ProgramInspector& inspector = *std::get<0>(started);
+  EXPECT_EQ(inspector.runningProgram(::getpid()).index(), 0u);
+  pid_t process = 0;
+  std::ifstream("/proc/thread-self/children") >> process;
+  ASSERT_GT(process, 0);
+  size_t blocked = 0;
+  // It is waited for two seconds only, in which a busy machine may not bring all of them to where they wait.
+  for (int round = 0; round < 30 && blocked == 0; ++round) {
+    ASSERT_EQ(::kill(process, SIGSTOP), 0);
+    WorkerPool pool({.runnable = 2, .maxWorkers = kWorkers});
+    std::atomic<size_t> finished{0};
+    std::vector<std::shared_ptr<SerialQueue>> queues;
+    for (size_t i = 0; i < kQuestions; ++i) {
+      queues.push_back(SerialQueue::create("test.question", pool, 1001));
+      queues.back()->async([&] {
+        static_cast<void>(inspector.runningProgram(::getpid()));
+        ++finished;
+      });
+    }
+    ASSERT_TRUE(eventually([&] {
+      const WorkerPoolFigures figures = pool.figures();
+      const bool allWait = figures.blocked > 2 && figures.blocked + figures.idle == figures.workers;
+      if (allWait && figures.blocked + figures.waitingQueues == kQuestions) blocked = figures.blocked;
+      return blocked != 0 || finished == kQuestions;
+    }));
+    ASSERT_EQ(::kill(process, SIGCONT), 0);
+    ASSERT_TRUE(eventually([&] { return finished == kQuestions; }));
+    pool.shutDown();
+    ASSERT_TRUE(eventually([&] { return inspector.runningProgram(::getpid()).index() == 0; }));
+  }
+  EXPECT_GT(blocked, 0u) << "all that may wait do";
+  EXPECT_LE(blocked, kWorkers / 5 + 3) << "the one that asks, and two that were about to wait";
 }
 
 TEST_F(TomlEntitlementsTest, WhatCannotBeOpenedForAMomentKeepsItsGrants) {
