@@ -5,11 +5,13 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <utility>
 
 #include "platform/base/Blocking.h"
 #include "platform/linux/files/Files.h"
+#include "platform/queues/Gate.h"
 #include "platform/queues/Log.h"
 
 namespace kyt {
@@ -118,13 +120,13 @@ class DlopenPluginBundles::LoadableBundle final : public PluginBundle {
  public:
   LoadableBundle(std::string file, Log& log) : file_(std::move(file)), log_(log) {}
 
-  [[nodiscard]] bool isLoaded() const override {
-    MutexLock lock(mutex_);
-    return library_ != nullptr;
-  }
+  [[nodiscard]] bool isLoaded() const override { return library_ != nullptr; }
+  // The disk may be slow, and so may what the library does while it is loaded.
   bool load() override {
-    MutexLock lock(mutex_);
-    if (library_ != nullptr) return true;
+    if (isLoaded()) return true;
+    const GateLock lock(loading_);
+    if (isLoaded()) return true;
+    const BlockingScope blocking;
     std::string objection = objectionTo(file_);
     if (objection.empty()) objection = open();
     if (objection.empty()) return true;
@@ -132,15 +134,15 @@ class DlopenPluginBundles::LoadableBundle final : public PluginBundle {
     return false;
   }
   [[nodiscard]] std::shared_ptr<PluginClass> classNamed(std::string_view name) override {
-    MutexLock lock(mutex_);
-    if (library_ == nullptr) return nullptr;
-    const auto make = symbol<New>(library_, std::string(name) + "_new");
+    void* const library = library_;
+    if (library == nullptr) return nullptr;
+    const auto make = symbol<New>(library, std::string(name) + "_new");
     if (make == nullptr) return nullptr;
-    return std::make_shared<LoadedClass>(library_, std::string(name), make);
+    return std::make_shared<LoadedClass>(library, std::string(name), make);
   }
 
  private:
-  std::string open() REQUIRES(mutex_) {
+  std::string open() REQUIRES(loading_) {
     void* library = ::dlopen(file_.c_str(), RTLD_NOW | RTLD_LOCAL);
     if (library == nullptr) {
       const char* text = ::dlerror();
@@ -157,8 +159,8 @@ class DlopenPluginBundles::LoadableBundle final : public PluginBundle {
 
   const std::string file_;
   Log& log_;
-  mutable Mutex mutex_;
-  void* library_ GUARDED_BY(mutex_) = nullptr;
+  Gate loading_;
+  std::atomic<void*> library_{nullptr};  // set once, by who is in the gate
 };
 
 DlopenPluginBundles::DlopenPluginBundles(std::string root, Log& log) : root_(std::move(root)), log_(log) {}

@@ -107,7 +107,7 @@ TEST_F(PluginTest, CallsAnObjectsOperationByItsName) {
   EXPECT_EQ(kept.objects, 0);
 }
 
-TEST_F(PluginTest, EachCallIsAnnouncedAsAWait) {
+TEST_F(PluginTest, LoadingAndEachCallAreAnnouncedAsWaits) {
   struct Observer final : BlockingObserver {
     void willBlock(BlockingKind) override { ++waits; }
     void hasBlocked() override { ++ends; }
@@ -115,18 +115,21 @@ TEST_F(PluginTest, EachCallIsAnnouncedAsAWait) {
   } observer;
   install();
   const auto bundle = bundles_.bundleWithPath(kBundle);
-  ASSERT_TRUE(bundle->load());
-  const auto adaptor = bundle->classNamed("QDXAdaptor");
   BlockingObserver* const former = BlockingObserver::exchange(&observer);
-  auto object = adaptor->newInstance();
+  EXPECT_TRUE(bundle->load());
   EXPECT_EQ(observer.waits, 1);
-  object->invoke(kOperation, 1, 2, {});
+  EXPECT_TRUE(bundle->load());
+  EXPECT_EQ(observer.waits, 1) << "it is loaded";
+  const auto adaptor = bundle->classNamed("QDXAdaptor");
+  auto object = adaptor->newInstance();
   EXPECT_EQ(observer.waits, 2);
-  EXPECT_EQ(object->description(), "the test's adaptor");
+  object->invoke(kOperation, 1, 2, {});
   EXPECT_EQ(observer.waits, 3);
-  object.reset();
+  EXPECT_EQ(object->description(), "the test's adaptor");
   EXPECT_EQ(observer.waits, 4);
-  EXPECT_EQ(observer.ends, 4);
+  object.reset();
+  EXPECT_EQ(observer.waits, 5);
+  EXPECT_EQ(observer.ends, 5);
   BlockingObserver::exchange(former);
 }
 
