@@ -4,6 +4,8 @@
 #include <exception>
 #include <random>
 
+#include "platform/base/Allocation.h"
+
 namespace kyt::detail {
 namespace {
 
@@ -65,8 +67,7 @@ uint32_t hashOf(std::string_view text) noexcept {
 
 IndexBlock* newIndex(size_t capacity) {
   const size_t slots = std::bit_ceil(capacity + capacity / 2);
-  void* memory = std::calloc(1, sizeof(IndexBlock) + slots * sizeof(IndexSlot));
-  if (memory == nullptr) throw std::bad_alloc();
+  void* memory = allocateZeros(sizeof(IndexBlock) + slots * sizeof(IndexSlot));
   return ::new (memory) IndexBlock{static_cast<uint32_t>(slots - 1), 0};
 }
 
@@ -143,9 +144,7 @@ void refillIndex(DictionaryBlock& block) noexcept {
 
 IndexBlock* copyOfIndex(IndexBlock& index) {
   const size_t size = sizeof(IndexBlock) + (index.mask + size_t{1}) * sizeof(IndexSlot);
-  void* memory = std::malloc(size);
-  if (memory == nullptr) throw std::bad_alloc();
-  return static_cast<IndexBlock*>(std::memcpy(memory, &index, size));
+  return static_cast<IndexBlock*>(std::memcpy(allocate(size), &index, size));
 }
 
 }  // namespace kyt::detail

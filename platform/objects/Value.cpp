@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "platform/base/Allocation.h"
 #include "platform/objects/DictionaryIndex.h"
 
 namespace kyt {
@@ -15,12 +16,6 @@ namespace {
 
 // Lengths are 32 bits wide; nothing that comes from outside may be nearly as long.
 constexpr size_t kMaxBlockSize = UINT32_MAX - 4096;
-
-void* allocate(size_t size) {
-  void* memory = std::malloc(size);
-  if (memory == nullptr) throw std::bad_alloc();
-  return memory;
-}
 
 Block* newBytesBlock(size_t size, size_t extra) {
   if (size > kMaxBlockSize) throw std::bad_alloc();

@@ -2,7 +2,8 @@
 // that; the first refusal gives it up, says so on standard error, and asks for the end, and then what was asked for is
 // tried again. When even that is used up the process ends at once, with a line and status 1.
 //
-// It concerns what C++ code allocates. Libraries in C get a null pointer, and report an error.
+// It concerns what C++ code allocates, with operator new or as objects do (platform/base/Allocation.h). Libraries in C get
+// a null pointer, and report an error.
 #pragma once
 
 #include <atomic>
