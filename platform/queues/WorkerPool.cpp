@@ -92,7 +92,7 @@ class WorkerPool::Implementation {
   // Those of workers that ended are used again.
   std::vector<std::unique_ptr<Worker>> slots_ GUARDED_BY(mutex_);
   std::vector<Worker*> idle_ GUARDED_BY(mutex_);  // asleep; the last one is woken first
-  OwnerLines ready_ GUARDED_BY(mutex_);
+  OwnerLines<SerialQueue> ready_ GUARDED_BY(mutex_);
   std::map<uint64_t, Queues> parked_ GUARDED_BY(mutex_);  // queues of owners that hold their share
   uint64_t unparked_ GUARDED_BY(mutex_) = 0;              // the owner whose turn it was last
   ConditionVariable allEnded_;

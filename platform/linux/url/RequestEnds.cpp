@@ -67,7 +67,7 @@ void RequestEnds::attemptEnded(URLTransfer& transfer, CURLcode code) {
     if (!connection->transfers.empty()) pools_.retirePoolOf(transfer);  // others may still read from it
     requests_.withdraw(transfer);
     if (connection->transfers.empty()) connection->letGo();
-    requests_.activate(transfer);
+    requests_.activateAgain(transfer);
     return;
   }
   if (code != CURLE_OK) {
@@ -122,7 +122,7 @@ void RequestEnds::failWith(URLTransfer& transfer, CURLcode code) {
 bool RequestEnds::goAgainOrWait(URLTransfer& transfer) {
   if (transfer.immediateRetries < kMostRepeats) {
     ++transfer.immediateRetries;
-    requests_.activate(transfer);
+    requests_.activateAgain(transfer);
     return true;
   }
   if (!transfer.session->configuration.waitsForConnectivity || requests_.canLeave(transfer)) return false;
@@ -184,7 +184,7 @@ bool RequestEnds::retryOrWait(URLTransfer& transfer, CURLcode code, long systemE
   if (transfer.attempt.routes != routes_.changes() && systemError != ECONNREFUSED) wasOffline = true;
   if (!wasOffline || transfer.immediateRetries >= kImmediateRetries) return false;
   ++transfer.immediateRetries;
-  requests_.activate(transfer);
+  requests_.activateAgain(transfer);
   return true;
 }
 

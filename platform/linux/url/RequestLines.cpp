@@ -9,7 +9,7 @@ namespace kyt {
 namespace {
 
 // The address up to its path. Two spellings of one server count as two.
-std::string_view serverOf(const URLTransfer& transfer) {
+std::string_view serverName(const URLTransfer& transfer) {
   const std::string_view url = transfer.request.url;
   const size_t scheme = url.find("://");
   if (scheme == url.npos) return url;
@@ -19,13 +19,10 @@ std::string_view serverOf(const URLTransfer& transfer) {
 }  // namespace
 
 bool RequestLines::mayGo(URLTransfer& transfer) {
-  const std::string_view name = serverOf(transfer);
-  auto found = servers_.find(name);
-  if (found == servers_.end()) found = servers_.emplace(std::string(name), Server()).first;
-  Server& server = found->second;
+  Server& server = serverOf(transfer)->second;
   // One with an end of its own (a storebag's) has no time to wait, and there are few of them.
-  if (!transfer.request.timeout && (active_ >= most_ || server.active >= mostToOneServer_)) {
-    server.line.push_back(transfer.self);
+  if (!transfer.request.timeout && (inLine_ > 0 || active_ >= most_ || server.active >= mostToOneServer_)) {
+    server.line.push(transfer.self);
     ++inLine_;
     return false;
   }
@@ -34,8 +31,13 @@ bool RequestLines::mayGo(URLTransfer& transfer) {
   return true;
 }
 
+void RequestLines::goesAgain(const URLTransfer& transfer) {
+  ++active_;
+  ++serverOf(transfer)->second.active;
+}
+
 void RequestLines::hasGone(const URLTransfer& transfer) {
-  const auto found = servers_.find(serverOf(transfer));
+  const auto found = servers_.find(serverName(transfer));
   --active_;
   --found->second.active;
   forgetIfUnused(found);
@@ -43,19 +45,37 @@ void RequestLines::hasGone(const URLTransfer& transfer) {
 
 std::shared_ptr<URLTransfer> RequestLines::next() {
   while (inLine_ > 0 && active_ < most_) {
-    auto best = servers_.end();
-    for (auto server = servers_.begin(); server != servers_.end(); ++server) {
-      if (server->second.line.empty() || server->second.active >= mostToOneServer_) continue;
-      if (best == servers_.end() || server->second.active < best->second.active) best = server;
-    }
-    if (best == servers_.end()) return nullptr;
-    std::shared_ptr<URLTransfer> transfer = std::move(best->second.line.front());
-    best->second.line.pop_front();
+    const auto server = nextServer();
+    if (server == servers_.end()) return nullptr;
+    std::shared_ptr<URLTransfer> transfer = server->second.line.pop();
     --inLine_;
-    forgetIfUnused(best);
-    if (transfer->phase == URLTransfer::Phase::inLine) return transfer;
+    if (transfer->phase == URLTransfer::Phase::inLine) {
+      server->second.lastTurn = ++turns_;
+      ++active_;
+      ++server->second.active;
+      return transfer;
+    }
+    forgetIfUnused(server);
   }
   return nullptr;
+}
+
+RequestLines::Servers::iterator RequestLines::serverOf(const URLTransfer& transfer) {
+  const std::string_view name = serverName(transfer);
+  const auto found = servers_.find(name);
+  return found != servers_.end() ? found : servers_.emplace(std::string(name), Server()).first;
+}
+
+RequestLines::Servers::iterator RequestLines::nextServer() {
+  auto best = servers_.end();
+  for (auto server = servers_.begin(); server != servers_.end(); ++server) {
+    const Server& one = server->second;
+    if (one.line.empty() || one.active >= mostToOneServer_) continue;
+    if (best == servers_.end() ||
+        std::pair(one.active, one.lastTurn) < std::pair(best->second.active, best->second.lastTurn))
+      best = server;
+  }
+  return best;
 }
 
 void RequestLines::forgetIfUnused(Servers::iterator server) {

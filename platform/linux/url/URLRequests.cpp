@@ -107,10 +107,16 @@ void URLRequests::displace(URLTransfer& oldest) {
 }
 
 void URLRequests::activate(URLTransfer& transfer) {
-  if (!lines_.mayGo(transfer)) {
-    transfer.phase = URLTransfer::Phase::inLine;
-    return;
-  }
+  if (lines_.mayGo(transfer)) return go(transfer);
+  transfer.phase = URLTransfer::Phase::inLine;
+}
+
+void URLRequests::activateAgain(URLTransfer& transfer) {
+  lines_.goesAgain(transfer);
+  go(transfer);
+}
+
+void URLRequests::go(URLTransfer& transfer) {
   URLConnectionPool& pool = pools_.poolFor(transfer);
   transfer.clearAttempt();
   transfer.attempt.lastProgress = tools_.now;
@@ -130,7 +136,7 @@ void URLRequests::activate(URLTransfer& transfer) {
 }
 
 void URLRequests::activateNextInLine() {
-  while (const std::shared_ptr<URLTransfer> next = lines_.next()) activate(*next);
+  while (const std::shared_ptr<URLTransfer> next = lines_.next()) go(*next);
 }
 
 bool URLRequests::canLeave(const URLTransfer& transfer) {
@@ -165,7 +171,7 @@ void URLRequests::routesSettled() {
 void URLRequests::emptyRetiredPools() {
   pools_.takeOutWhatHasNotBegun([this](URLTransfer& transfer) {
     withdraw(transfer);
-    activate(transfer);
+    activateAgain(transfer);
   });
   pools_.endRetired();
 }

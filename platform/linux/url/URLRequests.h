@@ -47,9 +47,10 @@ class URLRequests {
   [[nodiscard]] ConnectionPools& pools() { return pools_; }
 
   // How a request goes on, or ends.
-  void activate(URLTransfer& transfer);  // or puts it in line
-  void setAside(URLTransfer& transfer);  // it waits for connectivity
-  void withdraw(URLTransfer& transfer);  // from its pool, or from the waiting ones
+  void activate(URLTransfer& transfer);       // or puts it in line
+  void activateAgain(URLTransfer& transfer);  // one that was on its way until a moment ago
+  void setAside(URLTransfer& transfer);       // it waits for connectivity
+  void withdraw(URLTransfer& transfer);       // from its pool, or from the waiting ones
   void succeed(URLTransfer& transfer, int status);
   void fail(URLTransfer& transfer, int32_t code, std::string description);
   void armDeadline(URLTransfer& transfer);
@@ -58,6 +59,7 @@ class URLRequests {
 
  private:
   [[nodiscard]] bool loadCurl();
+  void go(URLTransfer& transfer);  // it has been counted
   void refuse(URLTransfer& transfer);
   void displace(URLTransfer& oldest);
   void finish(URLTransfer& transfer);  // its result is set

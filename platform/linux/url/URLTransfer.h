@@ -40,6 +40,9 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   // Delegate queue: calls the completion with the result.
   void deliver();
 
+  // Its user, for whom it stands in line (OutstandingBytes::User::owner).
+  [[nodiscard]] uint64_t owner() const { return user.owner(); }
+
   // The rest is for the network thread.
   enum class Phase : uint8_t { submitted, inLine, active, waiting, done };
 

@@ -12,16 +12,16 @@ namespace {
 
 class OwnerLinesTest : public ::testing::Test {
  protected:
-  OwnerLines::Queue queue(const char* name, uint64_t owner) {
+  OwnerLines<SerialQueue>::Item queue(const char* name, uint64_t owner) {
     return SerialQueue::create(name, executor_, owner);
   }
   std::string rest() {
     std::string names;
-    while (const OwnerLines::Queue next = lines_.pop()) names += next->label();
+    while (const OwnerLines<SerialQueue>::Item next = lines_.pop()) names += next->label();
     return names;
   }
   ManualExecutor executor_;
-  OwnerLines lines_;
+  OwnerLines<SerialQueue> lines_;
 };
 
 TEST_F(OwnerLinesTest, LetOwnersTakeTurns) {
@@ -37,7 +37,7 @@ TEST_F(OwnerLinesTest, LetOwnersTakeTurns) {
 TEST_F(OwnerLinesTest, WhoComesAgainStandsBehindItsOwnersOthers) {
   lines_.push(queue("a", 1000));
   lines_.push(queue("b", 1000));
-  const OwnerLines::Queue first = lines_.pop();
+  const OwnerLines<SerialQueue>::Item first = lines_.pop();
   lines_.push(first);
   lines_.push(queue("X", 1001));
   EXPECT_EQ(rest(), "bXa");
