@@ -7,6 +7,7 @@
 #include <utility>
 #include <variant>
 
+#include "daemon/DaemonReload.h"
 #include "daemon/DaemonServices.h"
 #include "platform/base/Paths.h"
 #include "platform/base/Settings.h"
@@ -53,9 +54,11 @@ std::string folderOfMessageLogs(const Paths& paths, Log& log) {
   return above ? std::string() : paths.systemLogs();
 }
 
-LinuxConfinement confinementOf(const Paths& paths, const Settings& settings, const std::string& logs) {
+LinuxConfinement confinementOf(const Paths& paths, const std::string& config, const Settings& settings,
+                               const std::string& logs) {
   return LinuxConfinement(paths.kytShare(),
                           {{"CONFIG", paths.configuration()},
+                           {"SETTINGS", config == paths.settings() ? "" : folderOf(config)},
                            {"SHARE", paths.kytShare()},
                            {"PLUGINS", paths.plugIns()},
                            {"STATE", paths.userDefaults()},
@@ -116,19 +119,26 @@ std::chrono::seconds lastMoment(const Limits& limits) {
   return kForTheRest + std::chrono::seconds(static_cast<int64_t>(std::ceil(limits.shutdownGraceSeconds)));
 }
 
-int waitForTheEnd(StopSignals& signals, Log& log) {
+int waitForTheEnd(StopSignals& signals, DaemonReload& reload) {
   for (;;) {
     const int signal = signals.wait();
     if (signal != SIGHUP) return signal;
-    log.normal(
-        "main: Signal 1 changes nothing: grants, user defaults, device properties and certificates are read whenever "
-        "they change, settings at the next start");
+    static_cast<void>(reload.reload());
   }
 }
 
-int serve(const Settings& settings, const Paths& paths, Log& log, Counters& counters,
-          ProgramInspector& inspector, const DeletionBroker* broker, std::unique_ptr<Deflate> deflate,
-          uint64_t memory, Confinement& confinement, StopSignals& stopSignals) {
+struct Configured {
+  Settings& settings;
+  const Paths& paths;
+  std::string settingsFile;
+  std::optional<LogLevel> logLevel;  // the command line's
+};
+
+int serve(const Configured& configured, Log& log, Counters& counters, ProgramInspector& inspector,
+          const DeletionBroker* broker, std::unique_ptr<Deflate> deflate, uint64_t memory,
+          Confinement& confinement, StopSignals& stopSignals) {
+  Settings& settings = configured.settings;
+  const Paths& paths = configured.paths;
   auto socket = listeningSocket(paths);
   if (const Error* error = std::get_if<Error>(&socket)) {
     log.error("main: %s", error->localizedDescription.c_str());
@@ -161,11 +171,13 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
                            .acceptor = std::move(acceptor),
                            .socketActivated = activated,
                            .idle = [&stopSignals] { stopSignals.request(); }});
+  DaemonReload reload({configured.settingsFile, settings, log, configured.logLevel,
+                       [&services](const Settings& changed) { services.takeUp(changed); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
   static_cast<void>(giveBackCodePages());
-  const int signal = waitForTheEnd(stopSignals, log);
+  const int signal = waitForTheEnd(stopSignals, reload);
   endProcessAtTheLatest(lastMoment(settings.limits), reserve.isUsed() ? kOutOfMemory : 0);
   if (reserve.isUsed())
     log.error("main: Ending, the system refuses memory");
@@ -185,15 +197,16 @@ int serve(const Settings& settings, const Paths& paths, Log& log, Counters& coun
 int runDaemon(const DaemonOptions& options) {
   fillStandardDescriptors();
   StderrSink standardError;
-  Log log(standardError, options.logLevel);
+  Log log(standardError, options.logLevel.value_or(LogLevel::normal));
   const Paths paths = Paths::of(absolutePath(options.root), executableFolder());
   const std::string config = options.config.empty() ? paths.settings() : absolutePath(options.config);
-  const auto read = readSettings(config);
+  auto read = readSettings(config);
   if (const auto* error = std::get_if<TomlError>(&read)) {
     log.error("main: %s", error->text.c_str());
     return kCouldNotStart;
   }
-  const Settings& settings = std::get<Settings>(read);
+  Settings& settings = std::get<Settings>(read);
+  if (!options.logLevel) log.setLevel(settings.logLevel);
   Counters counters;
   const std::unique_ptr<LogSink> sink = makeLogSink(settings.logTarget, counters);
   log.setSink(*sink);
@@ -214,7 +227,7 @@ int runDaemon(const DaemonOptions& options) {
   }
   log.normal("startLogging: Daemon starts logging...");
   std::unique_ptr<Deflate> deflate = makeDeflate(settings.compression, log);
-  LinuxConfinement confinement = confinementOf(paths, settings, logs);
+  LinuxConfinement confinement = confinementOf(paths, config, settings, logs);
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   const uint64_t memory = memoryForTheDaemon();
@@ -225,8 +238,8 @@ int runDaemon(const DaemonOptions& options) {
   logWhatIsNotEnforced(confinement, log);
   log.debug("main: At most %llu descriptors",
             static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
-  return serve(settings, paths, log, counters, *inspector, broker.get(), std::move(deflate), memory,
-               confinement, stopSignals);
+  return serve({settings, paths, config, options.logLevel}, log, counters, *inspector, broker.get(),
+               std::move(deflate), memory, confinement, stopSignals);
 }
 
 }  // namespace kyt

@@ -9,14 +9,14 @@
 #include <optional>
 #include <string>
 
-#include "platform/queues/Log.h"
+#include "platform/base/LogLevel.h"
 
 namespace kyt {
 
 struct DaemonOptions {
-  std::string root;    // stands in front of every fixed path; empty: none
-  std::string config;  // the settings' file; empty: the fixed one
-  LogLevel logLevel = LogLevel::normal;
+  std::string root;                  // stands in front of every fixed path; empty: none
+  std::string config;                // the settings' file; empty: the fixed one
+  std::optional<LogLevel> logLevel;  // instead of the settings'
 };
 
 // The process's exit status: 0 after an orderly end, 1 when it could not start, -1 (255) when it could not be

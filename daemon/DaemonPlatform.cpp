@@ -52,7 +52,9 @@ TomlEntitlementsOptions entitlementsOptions(const Paths& paths) {
 }  // namespace
 
 DaemonPlatform::DaemonPlatform(Start start)
-    : budget(UserShares::of(start.settings.limits, start.memory, start.descriptors)),
+    : memoryForUsers(start.memory),
+      descriptorsForUsers(start.descriptors),
+      budget(UserShares::of(start.settings.limits, start.memory, start.descriptors)),
       reactor(std::move(start.reactor)),
       workers(workerPoolOptions(start.counters, start.log, budget)),
       deflate(std::move(start.deflate)),
@@ -93,5 +95,11 @@ DaemonPlatform::DaemonPlatform(Start start)
           .budget = budget,
           .books = books,
       } {}
+
+void DaemonPlatform::takeUp(const Settings& settings) {
+  const UserShares shares = UserShares::of(settings.limits, memoryForUsers, descriptorsForUsers);
+  for (const ShareRow& row : kShareRows) budget.shares()[row.share] = shares[row.share];
+  urlSessions.reconfigure({settings.caFile, settings.cellularInterfaces});
+}
 
 }  // namespace kyt

@@ -54,9 +54,12 @@ struct DaemonPlatform {
     uint64_t descriptors = 0;  // descriptors that the daemon may use, for the shares of users
   };
   explicit DaemonPlatform(Start start);
+  // What of changed settings counts while the daemon runs, but for those that are read anew each time. Any thread.
+  void takeUp(const Settings& settings);
   DaemonPlatform(const DaemonPlatform&) = delete;
   DaemonPlatform& operator=(const DaemonPlatform&) = delete;
 
+  const uint64_t memoryForUsers, descriptorsForUsers;
   UserBudget budget;
   Books books;
   LinuxClock clock;

@@ -43,6 +43,8 @@ class DaemonServices {
 
   // The listener takes connections from now on, and a service manager that asked for it is told that the daemon lives.
   void resume();
+  // See DaemonPlatform. Any thread.
+  void takeUp(const Settings& settings) { system_.takeUp(settings); }
   // The orderly end: refuses new work, ends every session on its queue, waits for outstanding requests, all
   // under one deadline, and ends all threads. Once, on the main thread. False when threads would not end: then the
   // process must, without destroying this.

@@ -7,26 +7,30 @@
 #include <cstdint>
 #include <optional>
 
+#include "platform/base/Adjustable.h"
+
 namespace kyt {
 
-// Set in kytreportingd.toml; the numbers are the defaults.
+// Set in kytreportingd.toml; the numbers are the defaults. Those that code reads whenever it needs them may change while
+// the daemon runs (daemon/SettingsReload.h).
 struct Limits {
-  uint64_t maxMessageBytes = 1048576;     // one IPC message, header and body: a client's buffer
-  uint64_t maxQueuedBytes = 4194304;      // replies and callbacks waiting for one client; twice that ends it
-  uint64_t maxConnections = 16384;        // all clients: descriptors
-  uint64_t maxConnectionsPerUser = 4096;  // one user cannot shut out the others
-  uint64_t maxUploadBytes = 268435456;    // one file: it is read into memory
-  uint64_t maxBatchBytes = 16777216;      // one back end's batch; then new events are dropped
-  uint64_t maxHierarchyTokensPerUser = 4096;      // tokens' arrays stay for the life of the process
-  uint64_t maxSharedDataBytesPerUser = 16777216;  // so does their shared data
-  uint64_t maxCustomIdentifiersPerUser = 250;     // of the 1,000 that are kept for good
+  Adjustable<uint64_t> maxMessageBytes = 1048576;  // one IPC message, header and body: a client's buffer
+  Adjustable<uint64_t> maxQueuedBytes =
+      4194304;  // replies and callbacks waiting for one client; twice that ends it
+  Adjustable<uint64_t> maxConnections = 16384;            // all clients: descriptors
+  Adjustable<uint64_t> maxConnectionsPerUser = 4096;      // one user cannot shut out the others
+  Adjustable<uint64_t> maxUploadBytes = 268435456;        // one file: it is read into memory
+  Adjustable<uint64_t> maxBatchBytes = 16777216;          // one back end's batch; then new events are dropped
+  Adjustable<uint64_t> maxHierarchyTokensPerUser = 4096;  // tokens' arrays stay for the life of the process
+  Adjustable<uint64_t> maxSharedDataBytesPerUser = 16777216;  // so does their shared data
+  Adjustable<uint64_t> maxCustomIdentifiersPerUser = 250;     // of the 1,000 that are kept for good
   // Of one user's clients together; without a value a part of the memory and the descriptors there are
   // (platform/base/UserBudget.h).
   std::optional<uint64_t> maxBytesPerUser;           // memory, but for files that are uploaded
   std::optional<uint64_t> maxUploadingBytesPerUser;  // files, read and not yet answered
   std::optional<uint64_t> maxDescriptorsPerUser;     // connections, and what came with unfinished messages
   double idleExitSeconds = 30;                       // socket-activated and without a session
-  double shutdownGraceSeconds = 5;                   // from SIGTERM to cancelling what is left
+  Adjustable<double> shutdownGraceSeconds = 5;       // from SIGTERM to cancelling what is left
 
   friend bool operator==(const Limits&, const Limits&) = default;
 

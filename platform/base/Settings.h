@@ -1,11 +1,13 @@
 // The deployment settings, as read from kytreportingd.toml (platform/linux/toml/TomlSettings.h) once at
-// start-up. Constant afterwards; the composition root owns them and hands the parts down.
+// start-up. Constant afterwards but for what a reload takes up (daemon/SettingsReload.h); the composition root owns them and
+// hands the parts down.
 #pragma once
 
 #include <string>
 #include <vector>
 
 #include "platform/base/Limits.h"
+#include "platform/base/LogLevel.h"
 
 namespace kyt {
 
@@ -28,6 +30,7 @@ struct Settings {
   std::vector<std::string> cellularInterfaces;  // glob patterns of interface names
   Limits limits;
   LogTarget logTarget = LogTarget::automatic;
+  LogLevel logLevel = LogLevel::normal;
   CompressionSettings compression;
   friend bool operator==(const Settings&, const Settings&) = default;
 };

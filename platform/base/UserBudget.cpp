@@ -16,7 +16,8 @@ constexpr uint64_t kPartOfDescriptors = 4;
 // Whoever allows larger files means them to be sent.
 uint64_t usualUploadingBytes(const Limits& limits, uint64_t partOfMemory) {
   const uint64_t usual = std::min(partOfMemory, Limits::maxUploadingBytes);
-  return limits.maxUploadBytes == Limits().maxUploadBytes ? usual : std::max(usual, limits.maxUploadBytes);
+  const uint64_t ofOne = limits.maxUploadBytes;
+  return ofOne == Limits().maxUploadBytes ? usual : std::max(usual, ofOne);
 }
 
 }  // namespace

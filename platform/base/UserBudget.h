@@ -17,6 +17,7 @@
 #include <unordered_map>
 #include <utility>
 
+#include "platform/base/Adjustable.h"
 #include "platform/base/Mutex.h"
 
 namespace kyt {
@@ -71,8 +72,8 @@ inline constexpr unsigned kLeftForMessages = 4;
 
 // The most that one user may have of each.
 struct UserShares {
-  std::array<uint64_t, static_cast<size_t>(Share::numberOfShares)> most{};
-  [[nodiscard]] uint64_t& operator[](Share share) { return most[static_cast<size_t>(share)]; }
+  std::array<Adjustable<uint64_t>, static_cast<size_t>(Share::numberOfShares)> most{};
+  [[nodiscard]] Adjustable<uint64_t>& operator[](Share share) { return most[static_cast<size_t>(share)]; }
   [[nodiscard]] uint64_t operator[](Share share) const { return most[static_cast<size_t>(share)]; }
 
   // What the settings say, and where they are silent a part of the memory (bytes) and descriptors that there are.
@@ -109,7 +110,7 @@ class UserAccount {
 class UserBudget {
  public:
   explicit UserBudget(const UserShares& shares) : shares_(shares) {}
-  // Changed only before there are accounts.
+  // One that is made smaller takes nothing away from who has more, and gives nothing more.
   [[nodiscard]] UserShares& shares() { return shares_; }
   [[nodiscard]] uint64_t most(Share share) const { return shares_[share]; }
   // The user's one account. It is forgotten once nobody has it and it holds nothing.

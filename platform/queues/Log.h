@@ -11,17 +11,12 @@
 #include <string>
 #include <string_view>
 
+#include "platform/base/LogLevel.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
 
 class LineLimits;
-
-enum class LogLevel : int {
-  debug = 0,
-  normal = 1,  // "default" in settings and on the command line
-  error = 2
-};
 
 // Where lines go: journald, standard error, or a test's memory. Called from any thread, concurrently.
 class LogSink {

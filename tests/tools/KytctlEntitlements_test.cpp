@@ -188,7 +188,8 @@ TEST_F(KytctlEntitlements, NamesFilesThatCountForNothingAndWhy) {
               file("a.toml") +
                   ": others than root can write the file. It is ignored\n  its mode is 0666, its owner ");
   EXPECT_SAYS(run, file("b.toml") + ":3: ");
-  EXPECT_SAYS(run, file("c.toml") + ":2: \"usr\" is unknown. The grant is ignored\n");
+  EXPECT_SAYS(run, file("c.toml") +
+                       ":2: \"usr\" is unknown; the nearest known one is \"user\". The grant is ignored\n");
   EXPECT_SAYS(run,
               file("d.toml") + ":1: a grant without user, group, executable and security_label is ignored\n");
   for (const char* name : {"e.txt", ".f.toml"})

@@ -28,8 +28,8 @@ TEST(ManualExamples, OfFilesAreTaken) {
   EXPECT_TRUE(std::get<EntitlementGrants>(grants).problems.empty());
   expectTaken(parseFlatToml(exampleOf("kytreportingd-device.toml.5", "device"), "device"));
   expectTaken(parseFlatToml(exampleOf("kytreportingd-defaults.5", "defaults"), "defaults"));
-  const ProfileVariables variables = {{"CONFIG", "/c"}, {"SHARE", "/s"}, {"CA", "/a"},
-                                      {"STATE", "/t"},  {"LOGS", "/l"},  {"RUN", "/r"}};
+  const ProfileVariables variables = {{"CONFIG", "/c"}, {"SETTINGS", "/t"}, {"SHARE", "/s"}, {"CA", "/a"},
+                                      {"STATE", "/t"},  {"LOGS", "/l"},     {"RUN", "/r"}};
   expectTaken(parseProfile(exampleOf("kytreportingd-profile.5", "profile"), "profile", variables));
 }
 

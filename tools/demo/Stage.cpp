@@ -180,7 +180,9 @@ std::optional<Error> Stage::startDaemon(const std::string& insteadOfIt) {
   ChildProcess::Options how;
   how.outputFile = daemonLog();
   how.user = options_.daemonUser;
-  daemon_ = ChildProcess::start(started, {"--root", options_.folder, "--log-level", options_.logLevel}, how);
+  std::vector<std::string> arguments = {"--root", options_.folder};
+  if (!options_.logLevel.empty()) arguments.insert(arguments.end(), {"--log-level", options_.logLevel});
+  daemon_ = ChildProcess::start(started, arguments, how);
   if (!daemon_) return failure(started + ": " + std::strerror(errno));
   const bool up =
       waitUntil(seconds(30), [this] { return takesConnections(socketPath()) || !daemon_->isRunning(); });

@@ -25,7 +25,7 @@ class Stage {
     bool internalBuild = false;
     bool consent = true;
     std::string country = "DE";
-    std::string logLevel = "default";
+    std::string logLevel = "default";          // empty: as the settings say
     std::string extraSettings;                 // appended to kytreportingd.toml
     std::vector<std::string> serverArguments;  // further ones for the development server
     bool keepFolder = false;

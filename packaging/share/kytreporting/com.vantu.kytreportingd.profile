@@ -11,11 +11,13 @@
 #   ${SHARE}    <share>/kytreporting          ${RUN}      /run/kytreportingd
 #   ${PLUGINS}  /System/Library/PrivateFrameworks         ${LOGS}   /var/mobile/Library/Logs/Faultbin
 #   ${CA}       the folder of tls.ca_file, when one is set
+#   ${SETTINGS} the folder of --config's file, when it is not ${CONFIG}
 #
 # Folders stand here rather than files: a file that is replaced by renaming another over it would be out of reach.
 
 read = [
   "${CONFIG}",
+  "${SETTINGS}",           # read again at a reload
   "${SHARE}",
   "${PLUGINS}",
   "${CA}",

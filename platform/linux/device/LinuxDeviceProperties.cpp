@@ -257,4 +257,9 @@ int64_t LinuxDeviceProperties::secondsFromGMT(TimeValue time) {
   return offset;
 }
 
+std::vector<std::string> devicePropertyKeys() {
+  return {"ProductVersion", "BuildVersion",   "ProductType", "DeviceName", "HWModelStr",
+          "SerialNumber",   "UniqueDeviceID", "ReleaseType", "country"};
+}
+
 }  // namespace kyt

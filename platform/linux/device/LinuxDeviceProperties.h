@@ -19,6 +19,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Cryptography.h"
 #include "platform/DeviceProperties.h"
@@ -65,6 +66,9 @@ class LinuxDeviceProperties final : public DeviceProperties {
   Mutex mutex_;
   FlatTomlFile overrides_ GUARDED_BY(mutex_);
 };
+
+// Every key that device.toml may have.
+[[nodiscard]] std::vector<std::string> devicePropertyKeys();
 
 // The user default "consent" of the diagnostics domain; no value is no.
 class DefaultsDiagnosticsConsent final : public DiagnosticsConsent {

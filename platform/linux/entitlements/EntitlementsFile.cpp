@@ -7,8 +7,12 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/base/NearestName.h"
+
 namespace kyt {
 namespace {
+
+constexpr const char* kUnknown = "is unknown";
 
 std::optional<NameOrNumber> nameOrNumber(const TomlNode& node) {
   if (const auto* text = node.text(); text != nullptr && !text->empty()) return NameOrNumber(*text);
@@ -35,11 +39,18 @@ const char* readEntry(const std::string& key, const TomlNode& node, EntitlementG
     return nullptr;
   }
   if (node.table() != nullptr) return "must be a value (the name of an entitlement stands in quotes)";
-  if (key.find('.') == std::string::npos) return "is unknown";
+  if (key.find('.') == std::string::npos) return kUnknown;
   auto value = node.scalar();
   if (!value) return "must be text, a boolean or a number";
   grant.values.emplace(key, std::move(*value));
   return nullptr;
+}
+
+// "; the nearest known one is …", where there is one.
+std::string nearestCriterion(const std::string& key) {
+  const std::string known[] = {"user", "group", "executable", "security_label"};
+  const auto nearest = nearestName(key, known);
+  return nearest ? "; the nearest known one is \"" + *nearest + "\"" : "";
 }
 
 void readGrant(const TomlNode& node, std::string_view name, EntitlementGrants& result) {
@@ -51,8 +62,10 @@ void readGrant(const TomlNode& node, std::string_view name, EntitlementGrants& r
   grant.line = node.line;
   for (const auto& [key, entry] : *node.table()) {
     if (const char* wrong = readEntry(key, entry, grant)) {
-      result.problems.push_back(
-          tomlError(name, entry.line, "\"" + key + "\" " + wrong + ". The grant is ignored"));
+      result.problems.push_back(tomlError(name, entry.line,
+                                          "\"" + key + "\" " + wrong +
+                                              (wrong == kUnknown ? nearestCriterion(key) : "") +
+                                              ". The grant is ignored"));
       return;
     }
   }

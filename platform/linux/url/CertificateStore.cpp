@@ -81,8 +81,15 @@ bool addCertificates(X509_STORE* store, const std::string& contents) {
 
 }  // namespace
 
-CertificateStore::CertificateStore(std::string file)
-    : file_(std::move(file)), watched_(file_.empty() ? systemPlaces() : std::vector<std::string>{file_}) {}
+CertificateStore::CertificateStore(std::string file) {
+  setFile(std::move(file));
+}
+
+void CertificateStore::setFile(std::string file) {
+  file_ = std::move(file);
+  watched_ = file_.empty() ? systemPlaces() : std::vector<std::string>{file_};
+  read_.clear();
+}
 
 CertificateStore::~CertificateStore() {
   X509_STORE_free(store_);

@@ -22,6 +22,8 @@ class CertificateStore {
   CertificateStore(const CertificateStore&) = delete;
   CertificateStore& operator=(const CertificateStore&) = delete;
 
+  // From now on another file, or the system's. What was read before holds until that one can be read.
+  void setFile(std::string file);
   // For a connection's TLS settings, which take a reference; null when there is no readable certificate.
   [[nodiscard]] x509_store_st* store();
   // Another number each time that they have been read.
@@ -37,7 +39,7 @@ class CertificateStore {
   [[nodiscard]] static Seen look(const std::string& path);
   void load();
 
-  const std::string file_;
+  std::string file_;
   std::vector<std::string> watched_;  // the file, or the system's file and folders
   std::vector<Seen> read_;            // as they were when they were read
   x509_store_st* store_ = nullptr;

@@ -52,6 +52,10 @@ std::unique_ptr<URLSession> CurlURLSessionFactory::create(URLSessionConfiguratio
       std::make_shared<URLSessionState>(network_, std::move(configuration)));
 }
 
+void CurlURLSessionFactory::reconfigure(Access access) {
+  network_->reconfigure(std::move(access));
+}
+
 void CurlURLSessionFactory::cancelAwaited() {
   network_->cancelAwaited();
 }

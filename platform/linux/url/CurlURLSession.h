@@ -67,6 +67,13 @@ struct CurlURLSessionOptions {
 class CurlURLSessionFactory final : public URLSessionFactory {
  public:
   CurlURLSessionFactory(CurlURLSessionOptions options, Log& log, Counters& counters);
+  // Whom requests trust, and which interfaces count as cellular.
+  struct Access {
+    std::string certificateFile;
+    std::vector<std::string> cellularInterfaces;
+  };
+  // In place of what the options said: for requests that begin later, and connections made later. Any thread.
+  void reconfigure(Access access);
   // Cancels what is left, waits for the completions that run or are due (at most five seconds), ends the
   // threads. Sessions may outlive it and then start nothing. Not from a completion.
   ~CurlURLSessionFactory() override;

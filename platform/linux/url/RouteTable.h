@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/base/Descriptor.h"
@@ -23,6 +24,8 @@ class RouteTable {
   // `cellularInterfaces`: shell patterns of interface names. `sysClassNet`: where the kernel describes
   // interfaces.
   RouteTable(std::vector<std::string> cellularInterfaces, std::string sysClassNet, std::string resolverFile);
+
+  void setCellularInterfaces(std::vector<std::string> patterns) { cellularInterfaces_ = std::move(patterns); }
 
   // Whether a packet to the address would leave now; with `avoidCellular`, whether it can over another
   // interface.

@@ -55,6 +55,12 @@ void URLNetwork::cancelAll() {
   wakeUp();
 }
 
+// Taken up with the next command: what is on its way keeps what it began with.
+void URLNetwork::reconfigure(CurlURLSessionFactory::Access access) {
+  MutexLock lock(mutex_);
+  access_ = std::move(access);
+}
+
 void URLNetwork::wakeUp() {
   MutexLock lock(mutex_);
   if (running_) signalEventDescriptor(wake_.get());
@@ -205,6 +211,11 @@ void URLNetwork::handleEvent(uint64_t which, uint32_t events) {
 void URLNetwork::takeCommands() {
   {
     MutexLock lock(mutex_);
+    if (access_) {
+      tools_.certificates.setFile(std::move(access_->certificateFile));
+      tools_.routes.setCellularInterfaces(std::move(access_->cellularInterfaces));
+      access_.reset();
+    }
     if (commands_.empty()) return;
     taken_.swap(commands_);
   }

@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <vector>
 
@@ -33,6 +34,7 @@ class URLNetwork {
   void invalidate(std::shared_ptr<URLSessionState> session);
   void cancelAwaited();
   void cancelAll();
+  void reconfigure(CurlURLSessionFactory::Access access);
   // Cancels what is left, and ends the threads; false when completions still run after `patience`. Once, not from a
   // thread of this network.
   [[nodiscard]] bool stopWithin(Duration patience);
@@ -68,6 +70,7 @@ class URLNetwork {
   Mutex mutex_;
   Descriptor epoll_, wake_;  // written with the mutex held, before there is the thread
   std::vector<Command> commands_ GUARDED_BY(mutex_);
+  std::optional<CurlURLSessionFactory::Access> access_ GUARDED_BY(mutex_);  // to be taken up
   bool running_ GUARDED_BY(mutex_) = false;
   bool stopping_ GUARDED_BY(mutex_) = false;
   bool threadEnds_ GUARDED_BY(mutex_) = false;  // nothing is left for it to do

@@ -86,6 +86,7 @@ class LinuxConfinementTest : public testing::Test {
   static LinuxConfinement shippedFor(const TemporaryFolder& folder) {
     return {KYT_PACKAGING_SHARE,
             {{"CONFIG", folder / "etc/kytreportingd"},
+             {"SETTINGS", ""},
              {"SHARE", folder / "share"},
              {"PLUGINS", folder / "plugins"},
              {"STATE", folder / "var/lib/kytreportingd/defaults"},

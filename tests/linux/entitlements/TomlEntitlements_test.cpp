@@ -178,7 +178,8 @@ TEST_F(TomlEntitlementsTest, ALinkThatOthersMadeIsIgnoredWithALine) {
 TEST_F(TomlEntitlementsTest, WhatIsWrongCountsForNothingAndIsToldOnce) {
   const std::pair<std::string, std::string> bad[] = {
       {kGranted, ":1: a grant without user, group, executable and security_label is ignored"},
-      {"usre = 5\nuser = 5\n", ":2: \"usre\" is unknown. The grant is ignored"},
+      {"usre = 5\nuser = 5\n",
+       ":2: \"usre\" is unknown; the nearest known one is \"user\". The grant is ignored"},
       {"user = true\n", ":2: \"user\" must be a name or a number. The grant is ignored"},
       {"user = -1\n", ":2: \"user\" must be a name or a number. The grant is ignored"},
       {"user = 5\nexecutable = \"bin/x\"\n",

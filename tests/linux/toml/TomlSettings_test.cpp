@@ -74,10 +74,12 @@ idle_exit_seconds = 1.5
 shutdown_grace_seconds = 2
 [log]
 target = "stderr"
+level = "debug"
 [compression]
 library = "libdeflate"
 level = 9
 )");
+  EXPECT_EQ(settings.logLevel, LogLevel::debug);
   EXPECT_EQ(settings.caFile, "/etc/ca.pem");
   EXPECT_EQ(settings.cellularInterfaces, (std::vector<std::string>{"wwan*", "ppp0"}));
   EXPECT_EQ(settings.limits.maxMessageBytes, 11u);
@@ -112,9 +114,48 @@ TEST(TomlSettings, BothHostsAreRequired) {
 
 TEST(TomlSettings, UnknownKeysAndSectionsAreErrorsWithTheirLine) {
   EXPECT_EQ(errorOf(std::string(kHosts) + "[limits]\nmax_message_byte = 1\n"),
-            "k.toml:5: unknown key \"limits.max_message_byte\"");
-  EXPECT_EQ(errorOf(std::string(kHosts) + "\n[limit]\n"), "k.toml:5: unknown section or key \"limit\"");
+            "k.toml:5: unknown key \"limits.max_message_byte\"; the nearest known one is "
+            "\"limits.max_message_bytes\"");
+  EXPECT_EQ(errorOf(std::string(kHosts) + "\n[limit]\n"),
+            "k.toml:5: unknown section or key \"limit\"; the nearest known one is \"limits\"");
+  EXPECT_EQ(errorOf(std::string(kHosts) + "\n[unheard]\n"), "k.toml:5: unknown section or key \"unheard\"");
   EXPECT_EQ(errorOf("log = 1\n" + std::string(kHosts)), "k.toml:1: \"log\" must be a section");
+}
+
+TEST(TomlSettings, ProblemsAreToldAllAtOnce) {
+  const TemporaryFolder folder;
+  const std::string path = folder.write("k.toml", std::string(kHosts) +
+                                                      "[limits]\nmax_batch_byte = 1\nmax_connections = 0\n"
+                                                      "[log]\nlevel = \"loud\"\n");
+  std::vector<std::string> texts;
+  for (const TomlError& problem : problemsOfSettings(path)) texts.push_back(problem.text.substr(path.size()));
+  EXPECT_EQ(texts,
+            (std::vector<std::string>{":5: unknown key \"limits.max_batch_byte\"; the nearest known one is "
+                                      "\"limits.max_batch_bytes\"",
+                                      ":6: \"limits.max_connections\" must be a whole number of at least 1",
+                                      ":8: \"log.level\" must be \"debug\", \"default\" or \"error\""}));
+  folder.write("k.toml", kHosts);
+  EXPECT_TRUE(problemsOfSettings(path).empty());
+}
+
+TEST(TomlSettings, ChangesAreToldWithWhenTheyCount) {
+  const Settings before = parsed(kHosts);
+  EXPECT_TRUE(changedSettings(before, parsed(kHosts)).empty());
+  const Settings after = parsed(std::string(kHosts) +
+                                "[limits]\nmax_batch_bytes = 16\nmax_bytes_per_user = 19\n"
+                                "[log]\nlevel = \"error\"\ntarget = \"stderr\"\n"
+                                "[compression]\nlevel = 9\n");
+  const std::vector<SettingChange> changes = changedSettings(before, after);
+  Settings running = before;
+  std::string told;
+  for (const SettingChange& change : changes) {
+    told += change.name + (change.taking == Taking::whileRunning ? " " : " (start) ");
+    change.take(running, after);
+  }
+  EXPECT_EQ(
+      told,
+      "limits.max_bytes_per_user limits.max_batch_bytes log.target (start) log.level compression.level (start) ");
+  EXPECT_EQ(running, after);
 }
 
 TEST(TomlSettings, WrongTypesAndNumbersOutOfRangeAreErrorsWithTheirLine) {
