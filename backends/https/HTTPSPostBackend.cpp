@@ -9,6 +9,7 @@
 #include "platform/objects/Description.h"
 #include "platform/objects/Keys.h"
 #include "platform/queues/LineLimits.h"
+#include "platform/queues/LineOrder.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -164,6 +165,7 @@ void HTTPSPostBackend::addStopEntries(Dictionary& payload) const {
 
 Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timestamp, uint16_t method,
                                     uint16_t respCode, EventID, MessageFlag flag) {
+  if (LineOrder::holdsMuch()) line_.finish();
   struct Shared {  // what other sessions may change
     int32_t state;
     std::optional<SessionIDPath> sessionID;

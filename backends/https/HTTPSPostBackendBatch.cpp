@@ -12,6 +12,7 @@
 #include "platform/objects/Keys.h"
 #include "platform/objects/ObjectSize.h"
 #include "platform/queues/LineLimits.h"
+#include "platform/queues/LineOrder.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -189,13 +190,15 @@ Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, Flush
   return pretty;
 }
 
-// The records count with the user until the request does.
+// The records count with the user until the request does. The post's lines stand where it was decided on.
 void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batch, BookedEvents events,
                                   uint64_t bytes) {
   std::optional<OutgoingPost> post =
       newPost(MessageFlag{0}, std::nullopt, std::nullopt, nullptr, std::move(events));
   if (!post) return giveBackToUser(bytes);
-  line_.add([post = std::move(*post), batch = std::move(batch), bytes]() mutable {
+  line_.add([post = std::move(*post), batch = std::move(batch), bytes, taken = LineOrder::later()]() mutable {
+    const LineOrder::SharedPlace place = std::move(taken);
+    const LineOrder::Scope lines(place);
     const std::shared_ptr<UserAccount> account = post.reply.account;
     const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
     std::optional<BlockingScope> blocking;

@@ -150,6 +150,7 @@ void DBusConnection::end(Step how) {
   const std::optional<Life> before = life_.advance(Life::ended);
   if (!before) return;
   const ClientScope scope(user_);
+  const LineOrder::Scope lines(lines_);
   handshakeTimer_.cancel();
   patience_.end();
   if (handshake_ && how == Step::stopped) output_->sendHandshake(kServerEnds);

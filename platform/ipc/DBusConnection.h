@@ -32,6 +32,7 @@
 #include "platform/ipc/RemoteClient.h"
 #include "platform/ipc/ServerContext.h"
 #include "platform/ipc/SocketWatch.h"
+#include "platform/queues/LineOrder.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/Timer.h"
 
@@ -137,6 +138,7 @@ class DBusConnection final : public Connection,
   KeptBytes kept_ GUARDED_BY(*queue_);
   ReceivedDescriptors descriptors_ GUARDED_BY(*queue_);
   Patience patience_ GUARDED_BY(*queue_);
+  LineOrder lines_ GUARDED_BY(*queue_);
 };
 
 }  // namespace kyt

@@ -36,6 +36,7 @@ class HeldOutput {
 
 void DBusConnection::turn() {
   const ClientScope scope(user_);
+  const LineOrder::Scope lines(lines_);
   turnScheduled_ = false;
   if (life_.reached(Life::closed)) return;
   if (life_.reached(Life::ended)) {

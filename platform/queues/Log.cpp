@@ -9,6 +9,7 @@
 #include "platform/base/Limits.h"
 #include "platform/base/TextEscape.h"
 #include "platform/queues/LineLimits.h"
+#include "platform/queues/LineOrder.h"
 
 namespace kyt {
 
@@ -60,9 +61,9 @@ void Log::write(LogLevel level, const char* format, va_list arguments) {
   va_copy(again, arguments);
   const int length = std::vsnprintf(buffer, sizeof buffer, format, arguments);
   if (length < 0) {
-    sink_->write(level, format);  // a conversion failed: what it was about is better than nothing
+    writeOut(level, format);  // a conversion failed: what it was about is better than nothing
   } else if (static_cast<size_t>(length) < sizeof buffer) {
-    sink_->write(level, std::string_view(buffer, static_cast<size_t>(length)));
+    writeOut(level, std::string_view(buffer, static_cast<size_t>(length)));
   } else {
     // No more of it than is shown, and one byte, so that the cut does not go through a character.
     const auto whole = static_cast<size_t>(length);
@@ -80,7 +81,11 @@ void Log::writeLine(LogLevel level, std::string line, size_t whole) {
     line.resize(end);
     line.append(" (cut, ").append(std::to_string(whole)).append(" bytes in all)");
   }
-  sink_->write(level, line);
+  writeOut(level, line);
+}
+
+void Log::writeOut(LogLevel level, std::string_view line) {
+  if (!LineOrder::takes(*sink_, level, line)) sink_->write(level, line);
 }
 
 }  // namespace kyt

@@ -58,6 +58,8 @@ class Log {
 
  private:
   void write(LogLevel level, const char* format, va_list arguments) __attribute__((format(printf, 3, 0)));
+  // Or gives it to the order that this thread has entered (LineOrder).
+  void writeOut(LogLevel level, std::string_view line);
   // `line`: all `whole` bytes of it, or more than are shown.
   void writeLine(LogLevel level, std::string line, size_t whole);
   [[nodiscard]] bool isTooMuch(const char* format) const;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -100,6 +101,30 @@ TEST_P(BusyProgram, HasEachEventPostedOnceThoughItsSessionAndTheDaemonEndAtOnce)
   const std::vector<int> numbers = arrived();
   ASSERT_EQ(numbers.size(), static_cast<size_t>(kEvents)) << daemon_.log();
   for (int i = 0; i < kEvents; ++i) ASSERT_EQ(numbers[static_cast<size_t>(i)], i);
+}
+
+TEST_P(BusyProgram, LeavesTheLinesOfAPostBeforeThoseOfTheNextEvent) {
+  {
+    TestClient client(daemon_.socketPath(), kCadmor, "program");
+    ASSERT_EQ(client.configure(), "live: httppost") << daemon_.log();
+    report(client);
+    EXPECT_TRUE(client.finish());
+  }
+  daemon_.terminate();
+  EXPECT_EQ(daemon_.exitStatus(), 0);
+  std::istringstream log(daemon_.log());
+  int posts = 0;
+  bool awaited = false;
+  for (std::string line; std::getline(log, line);) {
+    if (line.find("as we reached event threshold") != std::string::npos) awaited = true;
+    if (awaited && line.find(": Compressed file from") != std::string::npos) {
+      awaited = false;
+      ++posts;
+    }
+    ASSERT_FALSE(awaited && line.find("HTTPSPostBackend(sendMessage)") != std::string::npos)
+        << "after " << posts << " posts: " << line;
+  }
+  EXPECT_GE(posts, kEvents / kThreshold - 1);
 }
 
 TEST_P(BusyProgram, LosesNothingThatTheDaemonHasTakenWhenItMustEndInBetween) {

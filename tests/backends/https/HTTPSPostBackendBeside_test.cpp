@@ -7,6 +7,7 @@
 
 #include "platform/base/Mutex.h"
 #include "platform/base/UserBudget.h"
+#include "platform/queues/LineOrder.h"
 #include "tests/backends/https/HTTPSFixture.h"
 
 namespace kyt {
@@ -88,6 +89,37 @@ TEST_F(HTTPSPostBackendBeside, ItsRequestIsTheSameAsOnTheSessionsQueue) {
   EXPECT_EQ(here.url, beside.url);
   EXPECT_EQ(here.headers, beside.headers);
   EXPECT_TRUE(here.body == beside.body);
+}
+
+TEST_F(HTTPSPostBackendBeside, ItsLinesStandBeforeThoseOfWhatComesAfterIt) {
+  LineOrder order;
+  const LineOrder::Scope scope(order);
+  decided();
+  sendBatch();
+  platform_.log.normal("what comes after it");
+  platform_.executor.runAll();
+  std::vector<std::string> lines;
+  for (const MemoryLogSink::Line& line : platform_.sink.lines())
+    for (const char* known : {"event threshold", "Compressed file", "Batching", "what comes after it"})
+      if (line.line.find(known) != std::string::npos) lines.emplace_back(known);
+  const size_t last = lines.size();
+  ASSERT_GE(last, 4u);
+  EXPECT_EQ(lines[last - 4], "Batching") << "of the event that is too much";
+  EXPECT_EQ(lines[last - 3], "event threshold");
+  EXPECT_EQ(lines[last - 2], "Compressed file");
+  EXPECT_EQ(lines[last - 1], "what comes after it");
+}
+
+TEST_F(HTTPSPostBackendBeside, ASessionWhoseLinesWaitInMassesWaitsForThePost) {
+  LineOrder order;
+  const LineOrder::Scope scope(order);
+  decided();
+  sendBatch();
+  while (!LineOrder::holdsMuch()) platform_.log.normal("%s", std::string(1000, 'x').c_str());
+  EXPECT_TRUE(poster_->requests.empty());
+  send(5);
+  EXPECT_EQ(poster_->requests.size(), 1u);
+  EXPECT_FALSE(LineOrder::holdsMuch());
 }
 
 TEST_F(HTTPSPostBackendBeside, ASmallBatchIsPostedAtOnce) {
