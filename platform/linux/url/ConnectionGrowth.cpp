@@ -38,6 +38,12 @@ void ConnectionGrowth::noMatter() {
   if (std::exchange(matters_, false) && most_ != kMost) patience_.set(tools_.now);
 }
 
+void ConnectionGrowth::noMatterNow() {
+  matters_ = false;
+  patience_.cancel();
+  if (std::exchange(most_, kMost) != kMost) callbacks_.allow(kMost);
+}
+
 void ConnectionGrowth::reset() {
   patience_.cancel();
   matters_ = true;

@@ -1,8 +1,8 @@
 // Decides how many connections a pool may have to one server. It begins with one: most answers come sooner than a further
 // connection would be there, and with TLS that costs as much as many requests. Where the oldest request that has not
 // begun waits too long all the same, since others are not answered, the number doubles, up to eight. It does not while it
-// is the network thread that is busy. Connections that carry many requests at once (HTTP/2) need no such care. Network
-// thread only.
+// is the network thread that is busy. Connections that carry many requests at once (HTTP/2) need no such care, and those
+// without TLS are cheaper than a wait. Network thread only.
 #pragma once
 
 #include "platform/base/Function.h"
@@ -28,6 +28,7 @@ class ConnectionGrowth {
   void leave(URLTransfer& transfer);  // it has, or has left the pool; also when it did not wait
   void connected(Duration took);      // another connection is there
   void noMatter();                    // from now on as many as may ever be, soon
+  void noMatterNow();                 // the same at once; not while libcurl is calling
   void reset();                       // nothing is in the pool
 
  private:

@@ -16,6 +16,10 @@ namespace {
 constexpr Duration kMostToConnect = std::chrono::seconds(1);  // then others do not wait for it any more
 constexpr size_t kKeptHandles = 2;                            // each keeps its buffers
 
+bool usesTLS(const URLTransfer& transfer) {
+  return strncasecmp(transfer.request.url.c_str(), "https:", 6) == 0;
+}
+
 CURLcode useCertificates(CURL*, void* context, void* connectionsOf) {
   auto& tools = *static_cast<NetworkTools*>(connectionsOf);
   x509_store_st* store = tools.certificates.store();
@@ -107,7 +111,7 @@ CURL* URLConnectionPool::takeHandle() {
 
 // A TLS session that is taken up again is not verified again, so none is once authorities have changed.
 bool URLConnectionPool::mayResume(const URLTransfer& transfer) {
-  if (strncasecmp(transfer.request.url.c_str(), "https:", 6) != 0) return true;
+  if (!usesTLS(transfer)) return true;
   const unsigned generation = tools_.certificates.generation();
   if (!certificates_) certificates_ = generation;
   return *certificates_ == generation;
@@ -123,6 +127,7 @@ std::shared_ptr<CURLSH> URLConnectionPool::ticketsFor(const URLTransfer& transfe
 }
 
 CURLcode URLConnectionPool::add(URLTransfer& transfer) {
+  if (!usesTLS(transfer)) growth_.noMatterNow();
   CURL* handle = multi_ == nullptr ? nullptr : takeHandle();
   if (handle == nullptr) return CURLE_OUT_OF_MEMORY;
   transfer.tickets = ticketsFor(transfer);

@@ -174,6 +174,22 @@ TEST_F(CurlURLSession, ClosesAllSurplusConnectionsOfABurst) {
   EXPECT_TRUE(server_.waitForConnectionsOpen(3));
 }
 
+TEST_F(CurlURLSession, WithoutTLSItsRequestsWaitForNoConnectionUntilThereAreEight) {
+  options_.connectionPatience = std::chrono::hours(1);  // what others wait before they make more
+  server_.setReply(reply(Behaviour::hold));
+  auto urls = session();
+  std::vector<Outcome> outcomes(10);
+  for (Outcome& outcome : outcomes) urls->start(post(server_.url("/"), "x"), outcome.completion());
+  EXPECT_TRUE(server_.waitForRequests(8));
+  EXPECT_EQ(server_.connectionsAccepted(), 8u);
+  server_.release();
+  for (Outcome& outcome : outcomes) {
+    ASSERT_TRUE(outcome.wait());
+    EXPECT_EQ(outcome.status(), 200);
+  }
+  EXPECT_EQ(server_.connectionsAccepted(), 8u);
+}
+
 TEST_F(CurlURLSession, ClosesItsConnectionsWhenItIsInvalidated) {
   auto urls = session();
   EXPECT_EQ(perform(*urls, get(server_.url("/"))).status(), 200);
