@@ -2,11 +2,11 @@
 // (Pipeline.h), and with the end of its record: the blocks of one batch are those of the last one, as in a
 // daemon that runs for long. The reference is the decoding of the same calls alone. Both print the processor
 // time of one event.
-#include <benchmark/benchmark.h>
 
 #include <span>
 
 #include "bench/Corpus.h"
+#include "bench/Measure.h"
 #include "bench/Pipeline.h"
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/MessageReader.h"
@@ -14,41 +14,41 @@
 namespace kyt::bench {
 namespace {
 
-void socketlessEventToBatch(benchmark::State& state) {
+void socketlessEventToBatch(Rounds& rounds) {
   Pipeline pipeline;
-  if (!pipeline.isLive()) return state.SkipWithError("no back end is live");
+  if (!pipeline.isLive()) return rounds.fail("no back end is live");
   size_t events = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     pipeline.fillBatch();
     pipeline.discardBatch();
     events += Pipeline::kEvents;
   }
   pipeline.fillBatch();
-  if (pipeline.batchedBytes() < Pipeline::kEvents * 100) state.SkipWithError("the events did not arrive");
-  state.SetItemsProcessed(static_cast<int64_t>(events));
+  if (pipeline.batchedBytes() < Pipeline::kEvents * 100) rounds.fail("the events did not arrive");
+  rounds.setItems(events);
 }
-BENCHMARK(socketlessEventToBatch);
+KYT_MEASURE(socketlessEventToBatch);
 
-void decodeAlone(benchmark::State& state) {
+void decodeAlone(Rounds& rounds) {
   std::vector<std::string> calls;
   for (const Dictionary& payload : corpusPayloads(Pipeline::kEvents))
     appendEventCall(calls.emplace_back(), 1000, 7, payload);
   size_t events = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     for (const std::string& call : calls) {
       Message message;
       const Frame frame = readMessage(std::as_bytes(std::span(call)), 1048576, message);
       BodyReader reader(message);
       Dictionary dictionary;
       if (frame.status != FrameStatus::complete || !reader.readDictionary(dictionary))
-        state.SkipWithError("the call was not decoded");
-      benchmark::DoNotOptimize(dictionary);
+        rounds.fail("the call was not decoded");
+      keep(dictionary);
     }
     events += calls.size();
   }
-  state.SetItemsProcessed(static_cast<int64_t>(events));
+  rounds.setItems(events);
 }
-BENCHMARK(decodeAlone);
+KYT_MEASURE(decodeAlone);
 
 }  // namespace
 }  // namespace kyt::bench

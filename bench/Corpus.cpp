@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <random>
 
 #include "platform/ipc/Handshake.h"
@@ -53,6 +54,49 @@ std::vector<Dictionary> corpusPayloads(size_t count) {
   return out;
 }
 
+namespace {
+
+std::string numbered(const char* stem, uint32_t number, int digits) {
+  std::string figures = std::to_string(number);
+  figures.insert(0, static_cast<size_t>(digits) - std::min(figures.size(), static_cast<size_t>(digits)), '0');
+  return stem + figures;
+}
+
+// Those beyond the ten: alternately a text of a few, an integer and a double.
+Value furtherValue(Draws& draws, size_t i) {
+  const uint32_t drawn = draws.below(1u << 20);
+  if (i % 3 == 0) return Value(numbered("value-", 100000 + drawn % 64 * 7919, 6));
+  if (i % 3 == 1) return Value(static_cast<int64_t>(drawn));
+  return Value(static_cast<double>(drawn) / 1e4);
+}
+
+}  // namespace
+
+std::vector<Dictionary> ordinaryPayloads(size_t count, size_t fields) {
+  Draws draws(20260201);
+  std::vector<Dictionary> out;
+  for (size_t i = 0; i < count; ++i) {
+    Dictionary payload = {{"id", numbered("@E00", static_cast<uint32_t>(i), 8)},
+                          {"state", numbered("running-", draws.below(9000), 4)},
+                          {"component", numbered("netmanager", draws.below(37), 2)},
+                          {"segment", numbered("segment-", draws.below(1000), 4)},
+                          {"channel", numbered("release-", draws.below(12), 4)},
+                          {"count", static_cast<int64_t>(i)},
+                          {"latency", static_cast<int64_t>(draws.below(100000))},
+                          {"bytes", static_cast<int64_t>(draws.below(10000000))},
+                          {"ratio", static_cast<double>(draws.below(1000000)) / 1e6},
+                          {"ok", draws.below(2) == 1}};
+    for (size_t field = payload.size(); field < fields; ++field)
+      payload.set(numbered("field_", static_cast<uint32_t>(field), 3), furtherValue(draws, field));
+    if (fields < payload.size()) {
+      size_t kept = 0;
+      payload.removeIf([&kept, fields](const String&, Value&) { return kept++ >= fields; });
+    }
+    out.push_back(std::move(payload));
+  }
+  return out;
+}
+
 void appendEventCall(std::string& out, uint32_t serial, uint16_t category, const Dictionary& payload) {
   MessageWriter writer(out);
   MessageWriter::Call call;
@@ -91,7 +135,7 @@ std::string openingCalls(uint32_t sessionID) {
   return out;
 }
 
-Dictionary benchBag(const std::string& postURL, int eventThreshold) {
+Dictionary benchBag(const std::string& postURL, int eventThreshold, bool consent) {
   Array filters;
   for (const char* key : {"secret", "account", "email", "phone", "address", "token", "cookie"})
     filters.append(Dictionary{{"key", key}, {"action", "remove"}});
@@ -100,7 +144,7 @@ Dictionary benchBag(const std::string& postURL, int eventThreshold) {
   filters.append(Dictionary{{"key", "longitude"}, {"action", "remove"}});
   const Dictionary client = {{"client", "bench"},
                              {"expedite", 0},
-                             {"override_dnu", 1},
+                             {"override_dnu", consent ? 0 : 1},
                              {"locale_whitelist", Array{"DE"}},
                              {"filters", filters},
                              {"sampling_threshold", 1.0},

@@ -1,11 +1,11 @@
 // The HTTPS back end's share of the road of one event: from the envelope into the batch, and from a batch of
 // 50 to the request. The reference of the second is the same work without the back end: the writer and zlib
 // alone, over the same records. Fakes stand in for the clock, the user defaults and the poster.
-#include <benchmark/benchmark.h>
 #include <zlib.h>
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "bench/Corpus.h"
+#include "bench/Measure.h"
 #include "platform/objects/Keys.h"
 #include "platform/queues/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
@@ -64,39 +64,39 @@ struct Stage {
   std::vector<Dictionary> envelopes;
 };
 
-void envelopeToBatch(benchmark::State& state) {
+void envelopeToBatch(bench::Rounds& rounds) {
   Stage stage;
   size_t i = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     Turn turn;
     for (int n = 0; n < kBatch; ++n) stage.send(i++);
-    state.PauseTiming();
+    rounds.pause();
     stage.backend->setState(kBackendStateHeld);
     stage.backend->flushMessagesWithCompletion(nullptr);  // gives the batch up
     stage.backend->setState(kBackendStateEnabled);
-    state.ResumeTiming();
+    rounds.goOn();
   }
-  state.SetItemsProcessed(state.iterations() * kBatch);
+  rounds.setItems(rounds.count() * kBatch);
 }
-BENCHMARK(envelopeToBatch);
+KYT_MEASURE(envelopeToBatch);
 
-void batchToRequest(benchmark::State& state) {
+void batchToRequest(bench::Rounds& rounds) {
   Stage stage;
   size_t i = 0;
-  for (auto _ : state) {
-    state.PauseTiming();
+  while (rounds.more()) {
+    rounds.pause();
     for (int n = 0; n < kBatch; ++n) stage.send(i++);
     stage.platform.executor.runAll();
-    state.ResumeTiming();
+    rounds.goOn();
     stage.backend->flushMessagesWithCompletion(nullptr);
   }
-  state.SetItemsProcessed(state.iterations() * kBatch);
-  state.counters["bytesPerRequest"] =
-      static_cast<double>(stage.poster->bytes) / static_cast<double>(stage.poster->requests);
+  rounds.setItems(rounds.count() * kBatch);
+  rounds.addFigure("bytesPerRequest",
+                   static_cast<double>(stage.poster->bytes) / static_cast<double>(stage.poster->requests));
 }
-BENCHMARK(batchToRequest);
+KYT_MEASURE(batchToRequest);
 
-void referenceWriterAndDeflate(benchmark::State& state) {
+void referenceWriterAndDeflate(bench::Rounds& rounds) {
   Stage stage;
   // As many batches as the back end posts different ones, so that no branch predictor learns one by heart.
   std::vector<Value> messages;
@@ -115,23 +115,25 @@ void referenceWriterAndDeflate(benchmark::State& state) {
   size_t next = 0;
   std::string json;
   std::string out(1 << 20, '\0');
-  for (auto _ : state) {
+  size_t bytes = 0;
+  while (rounds.more()) {
     json.clear();
     stage.platform.json.writeCompact(messages[next++ % messages.size()], json);
     z_stream stream{};
-    if (deflateInit2(&stream, -1, 8, 31, 8, 0) != Z_OK) return state.SkipWithError("deflateInit2");
+    if (deflateInit2(&stream, -1, 8, 31, 8, 0) != Z_OK) return rounds.fail("deflateInit2");
     stream.next_in = reinterpret_cast<Bytef*>(json.data());
     stream.avail_in = static_cast<uInt>(json.size());
     stream.next_out = reinterpret_cast<Bytef*>(out.data());
     stream.avail_out = static_cast<uInt>(out.size());
-    benchmark::DoNotOptimize(deflate(&stream, Z_FINISH));
-    state.counters["bytesPerRequest"] = static_cast<double>(stream.total_out);
+    bench::keep(deflate(&stream, Z_FINISH));
+    bytes = stream.total_out;
     deflateEnd(&stream);
   }
-  state.SetItemsProcessed(state.iterations() * kBatch);
-  state.counters["jsonBytes"] = static_cast<double>(json.size());
+  rounds.setItems(rounds.count() * kBatch);
+  rounds.addFigure("bytesPerRequest", static_cast<double>(bytes));
+  rounds.addFigure("jsonBytes", static_cast<double>(json.size()));
 }
-BENCHMARK(referenceWriterAndDeflate);
+KYT_MEASURE(referenceWriterAndDeflate);
 
 }  // namespace
 }  // namespace kyt

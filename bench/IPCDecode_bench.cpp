@@ -2,13 +2,13 @@
 // into objects. The reference decodes the same bytes with the same checks into one flat reserved array, in
 // two forms: of the same strings and values as objects, without the dictionaries around them (what the goal
 // of 1.3 is measured against), and of views into the buffer, which own nothing.
-#include <benchmark/benchmark.h>
 
 #include <cstring>
 #include <string>
 #include <vector>
 
 #include "bench/Corpus.h"
+#include "bench/Measure.h"
 #include "platform/Entitlements.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
@@ -161,9 +161,9 @@ struct ViewSink {
   std::vector<Entry> entries;
 };
 
-void DecodeEventCall(benchmark::State& state) {
+void DecodeEventCall(bench::Rounds& rounds) {
   size_t next = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     const std::string& bytes = calls()[next++ % calls().size()];
     Message message;
     const Frame frame = readMessage(std::as_bytes(std::span(bytes)), 1048576, message);
@@ -171,28 +171,28 @@ void DecodeEventCall(benchmark::State& state) {
     Dictionary dictionary;
     const bool read = frame.status == FrameStatus::complete && reader.hasSignature("a{sv}") &&
                       reader.readDictionary(dictionary) && reader.finish() == BodyStatus::ok;
-    if (!read || dictionary.size() < 3) state.SkipWithError("the call was not decoded");
-    benchmark::DoNotOptimize(dictionary);
+    if (!read || dictionary.size() < 3) rounds.fail("the call was not decoded");
+    bench::keep(dictionary);
   }
 }
-BENCHMARK(DecodeEventCall);
+KYT_MEASURE(DecodeEventCall);
 
 template <typename Sink>
-void FlatDecodeOfEventCall(benchmark::State& state) {
+void FlatDecodeOfEventCall(bench::Rounds& rounds) {
   size_t next = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     const std::string& bytes = calls()[next++ % calls().size()];
     Message message;
     const Frame frame = readMessage(std::as_bytes(std::span(bytes)), 1048576, message);
     Sink sink;
     const bool read = frame.status == FrameStatus::complete && message.signature == "a{sv}" &&
                       FlatDecoder<Sink>(message, sink).decode();
-    if (!read || sink.entries.size() < 12) state.SkipWithError("the call was not decoded");
-    benchmark::DoNotOptimize(sink);
+    if (!read || sink.entries.size() < 12) rounds.fail("the call was not decoded");
+    bench::keep(sink);
   }
 }
-BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ObjectSink);
-BENCHMARK_TEMPLATE(FlatDecodeOfEventCall, ViewSink);
+KYT_MEASURE(FlatDecodeOfEventCall<ObjectSink>);
+KYT_MEASURE(FlatDecodeOfEventCall<ViewSink>);
 
 // The server's whole turn on a stream in memory, for each call: everything but the system's reads.
 class CountingSession final : public ClientSessionInterface {
@@ -229,7 +229,7 @@ class Delegate final : public ListenerDelegate {
   std::shared_ptr<CountingSession> session = std::make_shared<CountingSession>();
 };
 
-void ServeEventCall(benchmark::State& state) {
+void ServeEventCall(bench::Rounds& rounds) {
   const Limits limits;
   UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 65536));
   Counters counters;
@@ -258,7 +258,7 @@ void ServeEventCall(benchmark::State& state) {
   constexpr int kBatch = 128;
   for (int i = 0; i < kBatch; ++i) batch += calls()[static_cast<size_t>(i)];
   int left = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     if (left-- == 0) {
       left = kBatch - 1;
       pipe->toServer = batch;
@@ -266,31 +266,31 @@ void ServeEventCall(benchmark::State& state) {
       executor.runAll();
     }
   }
-  if (delegate.session->entries == 0) state.SkipWithError("nothing was served");
+  if (delegate.session->entries == 0) rounds.fail("nothing was served");
 }
-BENCHMARK(ServeEventCall);
+KYT_MEASURE(ServeEventCall);
 
-void ReadHeaderOfEventCall(benchmark::State& state) {
+void ReadHeaderOfEventCall(bench::Rounds& rounds) {
   size_t next = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     const std::string& bytes = calls()[next++ % calls().size()];
     Message message;
-    benchmark::DoNotOptimize(readMessage(std::as_bytes(std::span(bytes)), 1048576, message));
-    benchmark::DoNotOptimize(message);
+    bench::keep(readMessage(std::as_bytes(std::span(bytes)), 1048576, message));
+    bench::keep(message);
   }
 }
-BENCHMARK(ReadHeaderOfEventCall);
+KYT_MEASURE(ReadHeaderOfEventCall);
 
-void EncodeEventCall(benchmark::State& state) {
+void EncodeEventCall(bench::Rounds& rounds) {
   const std::vector<Dictionary> payloads = bench::corpusPayloads(256);
   std::string bytes;
   size_t next = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     bytes.clear();
     bench::appendEventCall(bytes, 1, 3, payloads[next++ % payloads.size()]);
-    benchmark::DoNotOptimize(bytes);
+    bench::keep(bytes);
   }
 }
-BENCHMARK(EncodeEventCall);
+KYT_MEASURE(EncodeEventCall);
 
 }  // namespace

@@ -1,7 +1,6 @@
 // The objects on the road of one event: building a record of 26 keys and about 600 bytes, copying it,
 // changing the copy, and writing it as JSON. References for the same work stand beside: RapidJSON's document
 // for building and copying, and RapidJSON's own writer over a finished document for JSON.
-#include <benchmark/benchmark.h>
 #include <rapidjson/document.h>
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
@@ -10,6 +9,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/Measure.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "platform/objects/Value.h"
 
@@ -92,100 +92,99 @@ rapidjson::Document document() {
   return made;
 }
 
-void BuildRecord(benchmark::State& state) {
+void BuildRecord(bench::Rounds& rounds) {
   const auto ready = texts();
   int64_t number = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     Dictionary made = record(ready, ++number);
-    benchmark::DoNotOptimize(made);
+    bench::keep(made);
   }
 }
-BENCHMARK(BuildRecord);
+KYT_MEASURE(BuildRecord);
 
-void BuildRecordReferenceDocument(benchmark::State& state) {
-  for (auto _ : state) {
+void BuildRecordReferenceDocument(bench::Rounds& rounds) {
+  while (rounds.more()) {
     rapidjson::Document made = document();
-    benchmark::DoNotOptimize(made);
+    bench::keep(made);
   }
 }
-BENCHMARK(BuildRecordReferenceDocument);
+KYT_MEASURE(BuildRecordReferenceDocument);
 
-void CopyRecord(benchmark::State& state) {
+void CopyRecord(bench::Rounds& rounds) {
   const Dictionary made = record(texts(), 1);
-  for (auto _ : state) {
+  while (rounds.more()) {
     Dictionary copy(made);
-    benchmark::DoNotOptimize(copy);
+    bench::keep(copy);
   }
 }
-BENCHMARK(CopyRecord)->Threads(1)->Threads(4);
+KYT_MEASURE(CopyRecord);
+KYT_MEASURE(CopyRecord, {0}, 4);
 
-void ChangeCopyOfRecord(benchmark::State& state) {
+void ChangeCopyOfRecord(bench::Rounds& rounds) {
   const Dictionary made = record(texts(), 1);
-  for (auto _ : state) {
+  while (rounds.more()) {
     Dictionary copy(made);
     copy.set(numberKeys()[0], 2);
-    benchmark::DoNotOptimize(copy);
+    bench::keep(copy);
   }
 }
-BENCHMARK(ChangeCopyOfRecord);
+KYT_MEASURE(ChangeCopyOfRecord);
 
-void CopyReferenceDocument(benchmark::State& state) {
+void CopyReferenceDocument(bench::Rounds& rounds) {
   const rapidjson::Document made = document();
-  for (auto _ : state) {
+  while (rounds.more()) {
     rapidjson::Document copy;
     copy.CopyFrom(made, copy.GetAllocator());
-    benchmark::DoNotOptimize(copy);
+    bench::keep(copy);
   }
 }
-BENCHMARK(CopyReferenceDocument);
+KYT_MEASURE(CopyReferenceDocument);
 
-void FindEveryKey(benchmark::State& state) {
+void FindEveryKey(bench::Rounds& rounds) {
   const Dictionary made = record(texts(), 1);
-  for (auto _ : state)
-    for (const DictionaryEntry& entry : made) benchmark::DoNotOptimize(made.find(entry.key));
-  state.SetItemsProcessed(static_cast<int64_t>(state.iterations()) * 26);
+  while (rounds.more())
+    for (const DictionaryEntry& entry : made) bench::keep(made.find(entry.key));
+  rounds.setItems(rounds.count() * 26);
 }
-BENCHMARK(FindEveryKey);
+KYT_MEASURE(FindEveryKey);
 
-void WriteJSON(benchmark::State& state) {
+void WriteJSON(bench::Rounds& rounds) {
   const Value made(record(texts(), 1));
   RapidJSON json;
   std::string out;
-  for (auto _ : state) {
+  while (rounds.more()) {
     out.clear();
     json.writeCompact(made, out);
-    benchmark::DoNotOptimize(out.data());
+    bench::keep(out.data());
   }
-  state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * out.size()));
-  state.counters["bytes"] = static_cast<double>(out.size());
+  rounds.addFigure("bytes", static_cast<double>(out.size()));
 }
-BENCHMARK(WriteJSON);
+KYT_MEASURE(WriteJSON);
 
-void WriteJSONReferenceWriter(benchmark::State& state) {
+void WriteJSONReferenceWriter(bench::Rounds& rounds) {
   const rapidjson::Document made = document();
   rapidjson::StringBuffer buffer;
-  for (auto _ : state) {
+  while (rounds.more()) {
     buffer.Clear();
     rapidjson::Writer<rapidjson::StringBuffer> writer(buffer);
     made.Accept(writer);
-    benchmark::DoNotOptimize(buffer.GetString());
+    bench::keep(buffer.GetString());
   }
-  state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * buffer.GetSize()));
-  state.counters["bytes"] = static_cast<double>(buffer.GetSize());
+  rounds.addFigure("bytes", static_cast<double>(buffer.GetSize()));
 }
-BENCHMARK(WriteJSONReferenceWriter);
+KYT_MEASURE(WriteJSONReferenceWriter);
 
-void SetManyKeys(benchmark::State& state) {
+void SetManyKeys(bench::Rounds& rounds) {
   std::vector<String> keys;
-  for (int64_t i = 0; i < state.range(0); ++i) keys.emplace_back("hostile key " + std::to_string(i));
-  for (auto _ : state) {
+  for (size_t i = 0; i < rounds.argument(); ++i) keys.emplace_back("hostile key " + std::to_string(i));
+  while (rounds.more()) {
     Dictionary made;
     for (const String& key : keys) made.set(key, 1);
-    benchmark::DoNotOptimize(made);
+    bench::keep(made);
   }
-  state.SetItemsProcessed(static_cast<int64_t>(state.iterations()) * state.range(0));
+  rounds.setItems(rounds.count() * rounds.argument());
 }
-BENCHMARK(SetManyKeys)->Arg(32)->Arg(1000)->Arg(60000);
+KYT_MEASURE(SetManyKeys, {32, 1000, 60000});
 
 }  // namespace
 }  // namespace kyt

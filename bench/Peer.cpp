@@ -2,14 +2,10 @@
 
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <time.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <array>
 #include <cstring>
-#include <filesystem>
-#include <fstream>
 #include <span>
 #include <utility>
 
@@ -108,52 +104,6 @@ bool Peer::sendAndPing(std::string bytes) {
 }
 bool Peer::flush() {
   return call(wire::kSessionInterface, "FlushMessagesWithCompletion");
-}
-
-double processorSeconds(int pid) {
-  clockid_t clock{};
-  timespec spent{};
-  if (clock_getcpuclockid(pid, &clock) != 0 || clock_gettime(clock, &spent) != 0) return 0;
-  return static_cast<double>(spent.tv_sec) + static_cast<double>(spent.tv_nsec) / 1e9;
-}
-
-ProcessFigures figuresOf(int pid) {
-  ProcessFigures figures;
-  figures.processorSeconds = processorSeconds(pid);
-  const std::string process = "/proc/" + std::to_string(pid);
-  std::ifstream status(process + "/status");
-  for (std::string key; status >> key;) {
-    uint64_t value = 0;
-    if (key == "RssAnon:" && status >> value) figures.anonymousBytes = value * 1024;
-    if (key == "VmRSS:" && status >> value) figures.residentBytes = value * 1024;
-  }
-  std::error_code error;
-  for (const auto& task : std::filesystem::directory_iterator(process + "/task", error)) {
-    std::ifstream thread(task.path() / "status");
-    for (std::string key; thread >> key;) {
-      uint64_t value = 0;
-      if (key == "voluntary_ctxt_switches:" && thread >> value) figures.switches += value;
-    }
-  }
-  return figures;
-}
-
-OneProcessor::OneProcessor(std::initializer_list<int> pids) {
-  CPU_ZERO(&former_);
-  sched_getaffinity(0, sizeof former_, &former_);
-  cpu_set_t one;
-  CPU_ZERO(&one);
-  CPU_SET(static_cast<size_t>(std::max(sched_getcpu(), 0)), &one);
-  sched_setaffinity(0, sizeof one, &one);
-  std::error_code error;
-  for (const int pid : pids)
-    for (const auto& task :
-         std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", error))
-      sched_setaffinity(std::stoi(task.path().filename()), sizeof one, &one);
-}
-
-OneProcessor::~OneProcessor() {
-  sched_setaffinity(0, sizeof former_, &former_);
 }
 
 }  // namespace kyt::bench

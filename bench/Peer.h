@@ -2,10 +2,7 @@
 // load costs little beside what it measures.
 #pragma once
 
-#include <sched.h>
-
 #include <cstdint>
-#include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -34,28 +31,6 @@ class Peer {
   [[nodiscard]] bool awaitReply(uint32_t serial);
   int fd_ = -1;
   std::string in_;
-};
-
-// What the kernel says of a process.
-struct ProcessFigures {
-  double processorSeconds = 0;
-  uint64_t anonymousBytes = 0, residentBytes = 0;
-  uint64_t switches = 0;  // voluntary context switches of all its threads
-};
-[[nodiscard]] ProcessFigures figuresOf(int pid);
-[[nodiscard]] double processorSeconds(int pid);
-
-// Keeps the calling thread and all threads of these processes on the processor on which the caller is now;
-// lets the calling thread go at the end, the processes not.
-class OneProcessor {
- public:
-  explicit OneProcessor(std::initializer_list<int> pids);
-  ~OneProcessor();
-  OneProcessor(const OneProcessor&) = delete;
-  OneProcessor& operator=(const OneProcessor&) = delete;
-
- private:
-  cpu_set_t former_;
 };
 
 }  // namespace kyt::bench

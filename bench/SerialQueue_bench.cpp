@@ -1,12 +1,12 @@
 // What serial queues cost: a synchronous call on an idle queue, asynchronous work in a turn, and the way
 // through the pool. Each stands beside the plainest means for the same: a mutex, a call through a Task, two
 // threads that wake each other by condition variable.
-#include <benchmark/benchmark.h>
 
 #include <condition_variable>
 #include <mutex>
 #include <thread>
 
+#include "bench/Measure.h"
 #include "platform/base/Semaphore.h"
 #include "platform/fake/ManualExecutor.h"
 #include "platform/queues/SerialQueue.h"
@@ -26,66 +26,66 @@ struct OtherThread {
   }
 };
 
-void referenceMutex(benchmark::State& state) {
+void referenceMutex(bench::Rounds& rounds) {
   OtherThread other;
   std::mutex mutex;
   int value = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     mutex.lock();
-    benchmark::DoNotOptimize(++value);
+    bench::keep(++value);
     mutex.unlock();
   }
 }
-BENCHMARK(referenceMutex);
+KYT_MEASURE(referenceMutex);
 
-void syncOnAnIdleQueue(benchmark::State& state) {
+void syncOnAnIdleQueue(bench::Rounds& rounds) {
   OtherThread other;
   ManualExecutor executor;
   auto queue = SerialQueue::create("bench", executor);
   int value = 0;
-  for (auto _ : state) queue->sync([&] { benchmark::DoNotOptimize(++value); });
+  while (rounds.more()) queue->sync([&] { bench::keep(++value); });
 }
-BENCHMARK(syncOnAnIdleQueue);
+KYT_MEASURE(syncOnAnIdleQueue);
 
-void referenceTaskCall(benchmark::State& state) {
+void referenceTaskCall(bench::Rounds& rounds) {
   OtherThread other;
   int value = 0;
-  for (auto _ : state) {
-    Task task = [&value] { benchmark::DoNotOptimize(++value); };
-    benchmark::DoNotOptimize(task);
+  while (rounds.more()) {
+    Task task = [&value] { bench::keep(++value); };
+    bench::keep(task);
     task();
   }
 }
-BENCHMARK(referenceTaskCall);
+KYT_MEASURE(referenceTaskCall);
 
 // One event of a batch: the count is read, the record appended asynchronously; the next read runs the append.
-void asyncAndSyncInATurn(benchmark::State& state) {
+void asyncAndSyncInATurn(bench::Rounds& rounds) {
   OtherThread other;
   ManualExecutor executor;
   auto queue = SerialQueue::create("bench", executor);
   int value = 0;
   Turn turn;
-  for (auto _ : state) {
-    queue->sync([&] { benchmark::DoNotOptimize(value); });
+  while (rounds.more()) {
+    queue->sync([&] { bench::keep(value); });
     queue->async([&value] { ++value; });
   }
 }
-BENCHMARK(asyncAndSyncInATurn);
+KYT_MEASURE(asyncAndSyncInATurn);
 
-void turnsOf50Asyncs(benchmark::State& state) {
+void turnsOf50Asyncs(bench::Rounds& rounds) {
   OtherThread other;
   ManualExecutor executor;
   auto queue = SerialQueue::create("bench", executor);
   int value = 0;
-  for (auto _ : state) {
+  while (rounds.more()) {
     Turn turn;
-    for (int i = 0; i < 50; ++i) queue->async([&value] { benchmark::DoNotOptimize(++value); });
+    for (int i = 0; i < 50; ++i) queue->async([&value] { bench::keep(++value); });
   }
-  state.SetItemsProcessed(state.iterations() * 50);
+  rounds.setItems(rounds.count() * 50);
 }
-BENCHMARK(turnsOf50Asyncs);
+KYT_MEASURE(turnsOf50Asyncs);
 
-void referenceConditionRoundTrip(benchmark::State& state) {
+void referenceConditionRoundTrip(bench::Rounds& rounds) {
   std::mutex mutex;
   std::condition_variable changed;
   int turn = 0;  // 0: ours, 1: the other's, 2: the end
@@ -98,7 +98,7 @@ void referenceConditionRoundTrip(benchmark::State& state) {
       changed.notify_all();
     }
   });
-  for (auto _ : state) {
+  while (rounds.more()) {
     std::unique_lock lock(mutex);
     turn = 1;
     changed.notify_all();
@@ -111,22 +111,20 @@ void referenceConditionRoundTrip(benchmark::State& state) {
   changed.notify_all();
   other.join();
 }
-BENCHMARK(referenceConditionRoundTrip)->UseRealTime();
+KYT_MEASURE(referenceConditionRoundTrip);
 
-void submitToRunAndBack(benchmark::State& state) {
+void submitToRunAndBack(bench::Rounds& rounds) {
   WorkerPool pool{WorkerPoolOptions{}};
   auto queue = SerialQueue::create("bench", pool);
   Semaphore done;
-  for (auto _ : state) {
+  while (rounds.more()) {
     queue->async([&] { done.signal(); });
     done.wait();
   }
-  state.counters["wake-ups"] =
-      benchmark::Counter(static_cast<double>(pool.figures().wakeUps), benchmark::Counter::kAvgIterations);
+  rounds.addFigure("wake-ups",
+                   static_cast<double>(pool.figures().wakeUps) / static_cast<double>(rounds.count()));
 }
-BENCHMARK(submitToRunAndBack)->UseRealTime();
+KYT_MEASURE(submitToRunAndBack);
 
 }  // namespace
 }  // namespace kyt
-
-BENCHMARK_MAIN();

@@ -3,13 +3,17 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
+#include <openssl/err.h>
+#include <openssl/ssl.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
 #include <array>
+#include <cerrno>
 #include <charconv>
 #include <map>
+#include <span>
 
 namespace kyt::bench {
 
@@ -51,12 +55,42 @@ size_t wholeLength(const std::string& in, size_t& head) {
 
 }  // namespace
 
-SinkServer::SinkServer(unsigned threads, size_t keepBodies) : keepBodies_(keepBodies) {
-  for (unsigned i = 0; i < threads; ++i) {
-    const int listener = makeListener(port_);
-    if (port_ == 0) port_ = portOf(listener);
-    threads_.emplace_back([this, listener] { serve(listener); });
+struct SinkServer::Client {
+  Client(int socket, SSL_CTX* context) : fd(socket) {
+    if (context == nullptr) return;
+    tls.reset(SSL_new(context));
+    SSL_set_fd(tls.get(), fd);
+    SSL_set_accept_state(tls.get());
   }
+  ~Client() { close(fd); }
+  Client(const Client&) = delete;
+  Client& operator=(const Client&) = delete;
+
+  // Positive: bytes. Zero: nothing now. Negative: the end.
+  ssize_t read(std::span<char> bytes) {
+    if (tls == nullptr) {
+      const ssize_t got = recv(fd, bytes.data(), bytes.size(), 0);
+      if (got > 0) return got;
+      return got < 0 && errno == EAGAIN ? 0 : -1;
+    }
+    ERR_clear_error();
+    const int got = SSL_read(tls.get(), bytes.data(), static_cast<int>(bytes.size()));
+    if (got > 0) return got;
+    return SSL_get_error(tls.get(), got) == SSL_ERROR_WANT_READ ? 0 : -1;
+  }
+  bool answer() {
+    if (tls == nullptr) return send(fd, kAnswer, sizeof kAnswer - 1, MSG_NOSIGNAL) > 0;
+    return SSL_write(tls.get(), kAnswer, sizeof kAnswer - 1) > 0;
+  }
+
+  const int fd;
+  std::unique_ptr<SSL, decltype(&SSL_free)> tls{nullptr, &SSL_free};
+  std::string in;
+};
+
+SinkServer::SinkServer(unsigned threads, size_t keepBodies)
+    : threadsOfPort_(threads), keepBodies_(keepBodies) {
+  begin(port_, nullptr);
 }
 
 SinkServer::~SinkServer() {
@@ -64,25 +98,66 @@ SinkServer::~SinkServer() {
   for (std::thread& thread : threads_) thread.join();
 }
 
+bool SinkServer::addTLS(const std::string& certificate, const std::string& key) {
+  tls_.reset(SSL_CTX_new(TLS_server_method()), &SSL_CTX_free);
+  if (tls_ == nullptr || SSL_CTX_use_certificate_chain_file(tls_.get(), certificate.c_str()) != 1 ||
+      SSL_CTX_use_PrivateKey_file(tls_.get(), key.c_str(), SSL_FILETYPE_PEM) != 1)
+    return false;
+  // As web servers do: what was said in one connection is resumed in the next.
+  SSL_CTX_set_session_cache_mode(tls_.get(), SSL_SESS_CACHE_SERVER);
+  const unsigned char context[] = "bench";
+  SSL_CTX_set_session_id_context(tls_.get(), context, sizeof context - 1);
+  begin(portWithTLS_, tls_.get());
+  return true;
+}
+
+void SinkServer::begin(int& port, SSL_CTX* tls) {
+  for (unsigned i = 0; i < threadsOfPort_; ++i) {
+    const int listener = makeListener(port);
+    if (port == 0) port = portOf(listener);
+    threads_.emplace_back([this, listener, tls] { serve(listener, tls); });
+  }
+}
+
 std::vector<std::string> SinkServer::bodies() {
   const std::lock_guard lock(mutex_);
-  return bodies_;
+  return {bodies_.begin(), bodies_.end()};
 }
 
 void SinkServer::take(std::string&& body) {
   bodyBytes_ += body.size();
-  if (posts_.fetch_add(1) >= keepBodies_) return;
-  const std::lock_guard lock(mutex_);
-  bodies_.push_back(std::move(body));
+  {
+    const std::lock_guard lock(mutex_);
+    bodies_.push_back(std::move(body));
+    if (bodies_.size() > keepBodies_) bodies_.pop_front();
+  }
+  ++posts_;
 }
 
-void SinkServer::serve(int listener) {
+bool SinkServer::takeWhatCame(Client& client) {
+  std::array<char, 65536> bytes;
+  ssize_t got = client.read(bytes);
+  // What TLS has decrypted already, no report of the descriptor tells again.
+  for (; got > 0; got = client.read(bytes)) {
+    client.in.append(bytes.data(), static_cast<size_t>(got));
+    size_t head = 0;
+    for (size_t whole = wholeLength(client.in, head); whole <= client.in.size();
+         whole = wholeLength(client.in, head)) {
+      take(client.in.substr(head, whole - head));
+      client.in.erase(0, whole);
+      if (!client.answer()) return false;
+    }
+    if (client.tls == nullptr && static_cast<size_t>(got) < bytes.size()) return true;
+  }
+  return got == 0;
+}
+
+void SinkServer::serve(int listener, SSL_CTX* tls) {
   const int epoll = epoll_create1(EPOLL_CLOEXEC);
   epoll_event wanted{EPOLLIN, {.fd = listener}};
   epoll_ctl(epoll, EPOLL_CTL_ADD, listener, &wanted);
   std::map<int, Client> clients;
   std::array<epoll_event, 64> events;
-  std::array<char, 65536> bytes;
   while (!stopping_) {
     const int count = epoll_wait(epoll, events.data(), events.size(), 50);
     for (int i = 0; i < count; ++i) {
@@ -94,26 +169,13 @@ void SinkServer::serve(int listener) {
         setsockopt(made, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
         epoll_event client{EPOLLIN, {.fd = made}};
         epoll_ctl(epoll, EPOLL_CTL_ADD, made, &client);
-        clients[made];
+        clients.try_emplace(made, made, tls);
         continue;
       }
-      const ssize_t got = recv(fd, bytes.data(), bytes.size(), 0);
-      if (got <= 0) {
-        close(fd);
-        clients.erase(fd);
-        continue;
-      }
-      std::string& in = clients[fd].in;
-      in.append(bytes.data(), static_cast<size_t>(got));
-      size_t head = 0;
-      for (size_t whole = wholeLength(in, head); whole <= in.size(); whole = wholeLength(in, head)) {
-        take(in.substr(head, whole - head));
-        in.erase(0, whole);
-        if (send(fd, kAnswer, sizeof kAnswer - 1, MSG_NOSIGNAL) < 0) break;
-      }
+      const auto client = clients.find(fd);
+      if (client != clients.end() && !takeWhatCame(client->second)) clients.erase(client);
     }
   }
-  for (const auto& [fd, client] : clients) close(fd);
   close(epoll);
   close(listener);
 }
