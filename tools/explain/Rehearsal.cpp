@@ -296,6 +296,35 @@ const std::vector<JudgedRule>& Rehearsal::rules() const {
   return parts_->rules;
 }
 
+WholeSession Rehearsal::runWhole(const std::vector<Dictionary>& messages) {
+  Parts& parts = *parts_;
+  parts.call([&](ClientSessionInterface& session) {
+    session.setSessionInfo(parts.program.sessionInfo, parts.program.userInfo, Value(), false);
+    session.startConfigWithCompletionHandler(nullptr);
+  });
+  for (const Dictionary& message : messages) {
+    if (message.empty())
+      parts.flush();
+    else
+      parts.call(
+          [&](ClientSessionInterface& session) { session.sendMessageWithDictionary(message, nullptr); });
+  }
+  parts.made.clear();
+  parts.connection->invalidateNow();
+  parts.settle();
+  WholeSession whole;
+  for (BookRow& row : parts.books.snapshot())
+    if (!row.isInternal) whole.rows.push_back(std::move(row));
+  for (size_t i = 0; i < parts.urlSessions.requestCount(); ++i) {
+    const URLRequest request = parts.urlSessions.request(i);
+    if (request.method != "POST") continue;
+    ++whole.posts;
+    whole.bytes += request.url.size() + request.body.size();
+    for (const auto& [name, value] : request.headers) whole.bytes += name.size() + value.size() + 4;
+  }
+  return whole;
+}
+
 SessionOutcome Rehearsal::configure() {
   Parts& parts = *parts_;
   SessionOutcome outcome;

@@ -13,6 +13,7 @@
 
 #include "config/Environment.h"
 #include "platform/URLSession.h"
+#include "platform/base/Books.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
@@ -97,6 +98,13 @@ struct EventOutcome {
   [[nodiscard]] bool leaves() const;
 };
 
+// All of a session, from its start to its end.
+struct WholeSession {
+  std::vector<BookRow> rows;  // of the program's events, by back end; all is delivered or dropped
+  size_t posts = 0;
+  uint64_t bytes = 0;  // of their requests: lines, headers and bodies
+};
+
 class Rehearsal {
  public:
   // Answers the storebag's request. Called while the session is configured; may block.
@@ -112,6 +120,8 @@ class Rehearsal {
   SessionOutcome configure();
   // `message`: as it goes over the wire (Category, Type, Payload, Flag). What it left in a batch is flushed.
   EventOutcome send(const Dictionary& message);
+  // Instead of the two: configures, sends, ends. An empty message stands for a flush.
+  WholeSession runWhole(const std::vector<Dictionary>& messages);
   // So far, in order; of single messages each makes its own.
   [[nodiscard]] const std::vector<JudgedRule>& rules() const;
 

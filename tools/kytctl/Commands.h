@@ -54,6 +54,13 @@ struct ExplainOptions {
   bool json = false;
 };
 
+struct SimulateOptions {
+  std::string bag, events;  // files
+  uint32_t devices = 1000;
+  uint64_t seed = 1;
+  bool json = false;
+};
+
 [[nodiscard]] int sendCommand(const ConnectionOptions& connection, const SendOptions& options);
 [[nodiscard]] int sessionCommand(const ConnectionOptions& connection, const std::string& script);
 
@@ -81,6 +88,9 @@ struct ExplainOptions {
 [[nodiscard]] int verifyCommand(const std::string& document, const std::string& publicKey);
 // With a public key the signature is checked first.
 [[nodiscard]] int showCommand(const std::string& document, const std::string& publicKey);
+
+// Tells how many sessions and events of many devices leave by that bag.
+[[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);
 
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);

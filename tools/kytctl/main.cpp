@@ -13,6 +13,7 @@ struct Arguments {
   SignOptions sign;
   CheckOptions check;
   ExplainOptions explain;
+  SimulateOptions simulate;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
   int status = 0;
@@ -44,6 +45,12 @@ constexpr char kExplained[] =
   {"Category":10,"Type":1,"Payload":{"step":1},"Flag":0}
 Nothing is sent and nothing is stored; no daemon needs to run. What servers answer is not known here.
 The exit status is 0 when the event leaves, 1 when it does not, and 2 when that cannot be told.)";
+
+constexpr char kSimulated[] =
+    R"(Besides the steps of kytctl session there is one that says what devices there are, with weights:
+  {"do":"devices","countries":{"DE":3,"unknown":1},"families":{"Phone":1},"models":{"P1":1},"consent":0.8}
+and "perDay" of a step "open" is how many such sessions a device has each day. What is not said is what the bag
+names, in equal shares, and one that it does not name; the consent is given then.)";
 
 void addConnectionOptions(CLI::App& command, Arguments& arguments) {
   command.add_option("--socket", arguments.connection.socket,
@@ -176,6 +183,20 @@ void addStorebag(CLI::App& app, Arguments& a) {
   show->add_option("document", a.document, "The document; - for standard input")->required();
   show->add_option("--public-key", a.publicKey, "Check the signature with this public key first");
   show->callback([&a] { a.status = showCommand(a.document, a.publicKey); });
+  CLI::App* simulate =
+      bag->add_subcommand("simulate", "Tell how many sessions and events of many devices would leave");
+  simulate->add_option("bag", a.simulate.bag, "A document, or a bag (.json, .toml or .plist)")->required();
+  simulate
+      ->add_option("--events", a.simulate.events, "Sessions and events: steps as kytctl session takes them")
+      ->required();
+  simulate->add_option("--devices", a.simulate.devices, "How many devices")
+      ->check(CLI::Range(1, 1000000))
+      ->capture_default_str();
+  simulate->add_option("--seed", a.simulate.seed, "The same seed gives the same figures")
+      ->capture_default_str();
+  simulate->add_flag("--json", a.simulate.json, "Print one JSON object");
+  simulate->footer(kSimulated);
+  simulate->callback([&a] { a.status = simulateCommand(a.connection.root, a.simulate); });
 }
 
 }  // namespace

@@ -8,7 +8,7 @@ function __kytctl_words
             set value 0
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
                 --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
-                --service --storebag --draw
+                --service --storebag --draw --events --devices --seed
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -74,7 +74,7 @@ complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'
 complete -c kytctl -n '__kytctl_at consent' -a 'show grant withdraw'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
-complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show'
+complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate'
 
 for command in send session
     complete -c kytctl -n "__kytctl_at -b $command" -l socket -r -F -d 'The socket of the daemon'
@@ -113,4 +113,8 @@ complete -c kytctl -n '__kytctl_at -b storebag sign' -s o -l output -r -F -d 'Th
 for command in verify show
     complete -c kytctl -n "__kytctl_at -b storebag $command" -l public-key -r -F -d 'The public key'
 end
-complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show"' -F
+complete -c kytctl -n '__kytctl_at -b storebag simulate' -l events -r -F -d 'Sessions and events'
+complete -c kytctl -n '__kytctl_at -b storebag simulate' -l devices -x -d 'How many devices'
+complete -c kytctl -n '__kytctl_at -b storebag simulate' -l seed -x -d 'The same seed gives the same figures'
+complete -c kytctl -n '__kytctl_at -b storebag simulate' -l json -d 'Print JSON'
+complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show" "storebag simulate"' -F
