@@ -384,7 +384,7 @@ TEST(WhyDidMyEventNotArrive, QuotesWhatTheProgramsSay) {
   std::string sources;
   for (const char* folder : {"backends/https", "config", "daemon", "session", "tools/kytctl", "client"})
     for (const auto& file : std::filesystem::directory_iterator(std::string(KYT_SOURCE_DIR) + "/" + folder))
-      if (file.path().extension() == ".cpp")
+      if (file.path().extension() == ".cpp" || file.path().extension() == ".h")
         sources += textOf(std::string(folder) + "/" + file.path().filename().string());
   size_t quotes = 0;
   for (const std::string& quote :
