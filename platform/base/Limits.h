@@ -12,7 +12,7 @@
 namespace kyt {
 
 // Set in kytreportingd.toml; the numbers are the defaults. Those that code reads whenever it needs them may change while
-// the daemon runs (daemon/SettingsReload.h).
+// the daemon runs (daemon/DaemonReload.h).
 struct Limits {
   Adjustable<uint64_t> maxMessageBytes = 1048576;  // one IPC message, header and body: a client's buffer
   Adjustable<uint64_t> maxQueuedBytes =

@@ -1,5 +1,5 @@
 // The deployment settings, as read from kytreportingd.toml (platform/linux/toml/TomlSettings.h) once at
-// start-up. Constant afterwards but for what a reload takes up (daemon/SettingsReload.h); the composition root owns them and
+// start-up. Constant afterwards but for what a reload takes up (daemon/DaemonReload.h); the composition root owns them and
 // hands the parts down.
 #pragma once
 
