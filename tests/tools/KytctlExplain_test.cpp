@@ -144,6 +144,19 @@ TEST_F(KytctlExplain, StoresNothing) {
   EXPECT_EQ(arrived("client=person"), 0) << "and posts nothing";
 }
 
+TEST_F(KytctlExplain, ShowsTheDevicesIdentifierAndSaysWhereThereIsNone) {
+  prepare();
+  const auto identifier = [](const Dictionary& told) {
+    return description(*first(told, "posts").dictionary("message")->find("clientId"));
+  };
+  const std::string isNew = "The device has no such identifier (clientId) yet";
+  EXPECT_NE(joined(report(), "notes").find(isNew), std::string::npos);
+  ASSERT_EQ(kytctl({"defaults", "write", "com.vantu.kytreporting", "uuidRespectDnu", "own"}).status, 0);
+  const Dictionary told = report();
+  EXPECT_EQ(identifier(told), "own");
+  EXPECT_EQ(joined(told, "notes").find(isNew), std::string::npos);
+}
+
 TEST_F(KytctlExplain, NamesTheRuleThatKeepsAnEvent) {
   tools::Stage::Options options;
   options.consent = false;

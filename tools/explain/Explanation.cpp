@@ -98,6 +98,9 @@ Array notesIn(const Course& course, const ExplainFacts& facts) {
   if (category != nullptr && (category->unsignedIntValue() & 0xffffU) == 0)
     notes.emplace_back(
         "Category 0 is the daemon's own: servers take such an event for a session's start (Type 0) or stop (Type 1)");
+  if (course.event.isNewDevice)
+    notes.emplace_back(
+        "The device has no such identifier (clientId) yet: the daemon will make another than the one shown");
   if (!facts.program.sessionInfo.boolean(kKYTReportingSessionInfoRequireUserInfo))
     notes.emplace_back(
         "The session does not require user information (RequireUserInfo): no rule of consent, country, device, filters "

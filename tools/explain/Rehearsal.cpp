@@ -376,6 +376,9 @@ EventOutcome Rehearsal::send(const Dictionary& message) {
     parts.flush();
     parts.keepPosts(firstPost, outcome.posts);
   }
+  for (const KeptPost& post : outcome.posts)
+    if (const String* client = post.message.string("clientId"))
+      outcome.isNewDevice |= parts.defaults.hasMade(client->view());
   outcome.datagrams = parts.datagramsSent() - firstDatagram;
   outcome.handedToAdaptor = parts.pluginBundles.state->calls.size() - firstCall;
   outcome.reasons = parts.countedSince(before);

@@ -89,7 +89,9 @@ struct KeptPost {
 
 struct EventOutcome {
   std::vector<KeptPost> posts;
-  bool atOnce = false;         // the posts; otherwise with the next flush
+  bool atOnce = false;  // the posts; otherwise with the next flush
+  bool isNewDevice =
+      false;  // they have an identifier that the device has not stored yet: the daemon makes another
   size_t datagrams = 0;        // to the dashboard
   size_t handedToAdaptor = 0;  // of the diagnostics service
   std::vector<FilteredRecord> records;

@@ -2,9 +2,12 @@
 // gone with it. One thread.
 #pragma once
 
+#include <algorithm>
 #include <map>
 #include <string>
+#include <string_view>
 #include <utility>
+#include <vector>
 
 #include "platform/UserDefaults.h"
 
@@ -29,12 +32,19 @@ class ScratchUserDefaults final : public UserDefaults {
     const Value known = value(domain, key);
     if (const String* text = known.string()) return *text;
     own_[{std::string(domain), std::string(key)}] = Value(made);
+    made_.push_back(made.str());
     return made;
+  }
+
+  // Whether it was made here, and is another one wherever it is made for good.
+  [[nodiscard]] bool hasMade(std::string_view value) const {
+    return std::find(made_.begin(), made_.end(), value) != made_.end();
   }
 
  private:
   UserDefaults& stored_;
   std::map<std::pair<std::string, std::string>, Value> own_;
+  std::vector<std::string> made_;
 };
 
 }  // namespace kyt::tools
