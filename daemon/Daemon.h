@@ -1,9 +1,9 @@
 // The composition root: the one place that makes every object of the daemon, hands references down, and takes
 // the whole down again in reverse. Nothing else in the daemon includes an adapter of the operating system.
 //
-// run() is called on the main thread, before any other thread exists. It reads the settings, confines the
-// process, and then makes everything else; it returns when the daemon has ended in an orderly way, or could
-// not start.
+// runDaemon() is called on the main thread, before any other thread exists. It reads the settings, confines the
+// process, and then makes everything else; it returns when the daemon has ended in an orderly way, or could not
+// start. Where threads do not end it ends the process itself, with the same status.
 #pragma once
 
 #include <optional>
@@ -19,8 +19,8 @@ struct DaemonOptions {
   std::optional<LogLevel> logLevel;  // instead of the settings'
 };
 
-// The process's exit status: 0 after an orderly end, 1 when it could not start, -1 (255) when it could not be
-// confined.
+// The process's exit status: 0 after an orderly end; 1 when it could not start, or ended in order since the system
+// refused memory; -1 (255) when it could not be confined.
 [[nodiscard]] int runDaemon(const DaemonOptions& options);
 
 }  // namespace kyt

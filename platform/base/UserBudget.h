@@ -5,8 +5,9 @@
 //
 // Whoever keeps something on behalf of a client takes it from the user's account first, with a Charge where it can,
 // and does without when the account refuses. What exists already and must be kept is taken anyway, and makes the
-// account full for what comes next. The composition root owns the one UserBudget, which outlives its accounts. Any thread; taking costs one atomic operation. Without an account (null) nothing is counted and
-// nothing is refused: the daemon's own requests, and tests.
+// account full for what comes next. The composition root owns the one UserBudget, which outlives its accounts. Any
+// thread; taking costs one atomic operation. Without an account (null) nothing is counted and nothing is refused:
+// the daemon's own requests, and tests.
 #pragma once
 
 #include <array>
