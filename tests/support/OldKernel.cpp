@@ -14,28 +14,13 @@
 #include <cstring>
 #include <string>
 
+#include "tests/support/SendDescriptors.h"
+
 namespace kyt {
 namespace {
 
 constexpr uint64_t kKnownRights = (1ULL << 14) - 1;  // reading to REFER
 constexpr int kPeerProcess = 77;                     // SO_PEERPIDFD
-
-bool send(int socket, int descriptor) {
-  char byte = 0;
-  iovec part = {&byte, 1};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof descriptor)] = {};
-  msghdr message = {};
-  message.msg_iov = &part;
-  message.msg_iovlen = 1;
-  message.msg_control = control;
-  message.msg_controllen = sizeof control;
-  cmsghdr* header = CMSG_FIRSTHDR(&message);
-  header->cmsg_level = SOL_SOCKET;
-  header->cmsg_type = SCM_RIGHTS;
-  header->cmsg_len = CMSG_LEN(sizeof descriptor);
-  std::memcpy(CMSG_DATA(header), &descriptor, sizeof descriptor);
-  return ::sendmsg(socket, &message, 0) == 1;
-}
 
 int received(int socket) {
   char byte = 0;
@@ -88,7 +73,7 @@ void OldKernel::installHere() const {
                     seccomp_rule_add_array(filter, SCMP_ACT_ERRNO(ENOPROTOOPT), SCMP_SYS(getsockopt), 2,
                                            peerProcess) == 0 &&
                     seccomp_load(filter) == 0;
-  if (!made || !send(toTest_, seccomp_notify_fd(filter))) ::_exit(126);
+  if (!made || test::sendDescriptors(toTest_, "-", {seccomp_notify_fd(filter)}) != 1) ::_exit(126);
   ::close(seccomp_notify_fd(filter));
 }
 

@@ -20,6 +20,7 @@
 #include "platform/ipc/MessageReader.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/linux/base/Descriptors.h"
+#include "tests/support/SendDescriptors.h"
 
 namespace kyt::test {
 
@@ -49,21 +50,7 @@ class PlainClient {
   }
   bool send(std::string_view bytes, const std::vector<int>& descriptors = {}) {
     while (!bytes.empty()) {
-      iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
-      std::vector<char> control(CMSG_SPACE(sizeof(int) * descriptors.size()));
-      msghdr message{};
-      message.msg_iov = &piece;
-      message.msg_iovlen = 1;
-      if (!descriptors.empty()) {
-        message.msg_control = control.data();
-        message.msg_controllen = control.size();
-        cmsghdr* header = CMSG_FIRSTHDR(&message);
-        header->cmsg_level = SOL_SOCKET;
-        header->cmsg_type = SCM_RIGHTS;
-        header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
-        std::memcpy(CMSG_DATA(header), descriptors.data(), sizeof(int) * descriptors.size());
-      }
-      const ssize_t count = ::sendmsg(socket_.get(), &message, MSG_NOSIGNAL);
+      const ssize_t count = sendDescriptors(socket_.get(), bytes, descriptors);
       if (count <= 0) return false;
       bytes.remove_prefix(static_cast<size_t>(count));
       if (!descriptors.empty()) return bytes.empty() || send(bytes);

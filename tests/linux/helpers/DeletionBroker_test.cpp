@@ -22,11 +22,13 @@
 #include <fstream>
 #include <iterator>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
 #include "tests/support/ChildProcess.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/SendDescriptors.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -404,21 +406,8 @@ class ForgedRequest : public Broker {
     return -1;
   }
   static void send(const Words& words, size_t bytes, const std::vector<int>& descriptors) {
-    iovec part = {const_cast<Words*>(&words), bytes};
-    std::vector<char> control(CMSG_SPACE(sizeof(int) * descriptors.size()));
-    msghdr message = {};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    if (!descriptors.empty()) {
-      message.msg_control = control.data();
-      message.msg_controllen = control.size();
-      cmsghdr* header = CMSG_FIRSTHDR(&message);
-      header->cmsg_level = SOL_SOCKET;
-      header->cmsg_type = SCM_RIGHTS;
-      header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
-      std::memcpy(CMSG_DATA(header), descriptors.data(), sizeof(int) * descriptors.size());
-    }
-    ASSERT_EQ(::sendmsg(socketOfTheBroker(), &message, MSG_NOSIGNAL), static_cast<ssize_t>(bytes));
+    const std::string_view request(reinterpret_cast<const char*>(&words), bytes);
+    ASSERT_EQ(test::sendDescriptors(socketOfTheBroker(), request, descriptors), static_cast<ssize_t>(bytes));
   }
   // Sends it with a place for the answer behind file and folder, and `more` descriptors behind that. The answer, or
   // -1 when there is none.

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <thread>
@@ -222,15 +223,23 @@ TEST(JournalSink, EndsThoughTheJournalIsStopped) {
             "");
 }
 
+// What `work` says in a process that finds a journal of its own, with a sink for that, and a pipe as standard error.
+std::string withASink(
+    const std::function<std::string(std::unique_ptr<TestJournal>&, JournalSink&, const Pipe&)>& work) {
+  return withAJournal([&](std::unique_ptr<TestJournal>& journal) -> std::string {
+    const Pipe standardError;
+    if (::dup2(standardError.out.get(), 2) != 2) return "dup2";
+    Counters counters;
+    return work(journal, *JournalSink::open(counters), standardError);
+  });
+}
+
 TEST(JournalSink, WritesToStandardErrorWhatIsTooLargeForTheJournalsSocket) {
   if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
-  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>& journal) -> std::string {
-              const Pipe standardError;
-              if (::dup2(standardError.out.get(), 2) != 2) return "dup2";
-              Counters counters;
-              const auto sink = JournalSink::open(counters);
-              sink->write(LogLevel::error, std::string(1000000, 'x'));
-              sink->write(LogLevel::normal, "next");
+  EXPECT_EQ(withASink([](std::unique_ptr<TestJournal>& journal, JournalSink& sink,
+                         const Pipe& standardError) -> std::string {
+              sink.write(LogLevel::error, std::string(1000000, 'x'));
+              sink.write(LogLevel::normal, "next");
               return standardError.next().substr(0, 5) + messageOf(journal->nextEntry());
             }),
             "<3>xxMESSAGE=next");
@@ -238,21 +247,18 @@ TEST(JournalSink, WritesToStandardErrorWhatIsTooLargeForTheJournalsSocket) {
 
 TEST(JournalSink, FindsAJournalThatWasStartedAnewAndMeanwhileWritesToStandardError) {
   if (!mayMountOfItsOwn()) GTEST_SKIP() << "needs root to mount over /run";
-  EXPECT_EQ(withAJournal([](std::unique_ptr<TestJournal>& journal) -> std::string {
-              const Pipe standardError;
-              if (::dup2(standardError.out.get(), 2) != 2) return "dup2";
-              Counters counters;
-              const auto sink = JournalSink::open(counters);
-              sink->write(LogLevel::normal, "first");
+  EXPECT_EQ(withASink([](std::unique_ptr<TestJournal>& journal, JournalSink& sink,
+                         const Pipe& standardError) -> std::string {
+              sink.write(LogLevel::normal, "first");
               std::string all = messageOf(journal->nextEntry()) + ", ";
               journal = nullptr;
-              sink->write(LogLevel::error, "meanwhile\n");
-              sink->write(LogLevel::debug, "still");
+              sink.write(LogLevel::error, "meanwhile\n");
+              sink.write(LogLevel::debug, "still");
               all += standardError.next();
               all += standardError.next();
               if (::unlink("/run/systemd/journal/socket") != 0) return "unlink";
               journal = std::make_unique<TestJournal>();
-              sink->write(LogLevel::normal, "second");
+              sink.write(LogLevel::normal, "second");
               return all + messageOf(journal->nextEntry());
             }),
             "MESSAGE=first, <3>meanwhile\\n\n<7>still\nMESSAGE=second");

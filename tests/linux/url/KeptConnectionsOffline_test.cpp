@@ -113,6 +113,27 @@ class KeptConnectionsOffline : public CurlURLSessionFixture, public testing::Wit
     for (const auto& request : server_->requests()) count += request.body == body ? 1 : 0;
     return count;
   }
+  // Whether it ends with the server's reply.
+  static testing::AssertionResult succeeds(const Outcome& outcome) {
+    if (!outcome.wait()) return testing::AssertionFailure() << "it does not end";
+    if (outcome.status() == 200) return testing::AssertionSuccess();
+    return testing::AssertionFailure() << outcome.status() << ": " << outcome.errorText();
+  }
+  testing::AssertionResult arrives(URLSession& urls, const std::string& body) {
+    return succeeds(perform(urls, post(server_->url("/"), body)));
+  }
+  // Breaks the way and posts: what is sent on a kept connection does not arrive. Whether it has been sent.
+  bool lose(URLSession& urls, Outcome& outcome) {
+    if (!breakTheWay()) return false;
+    urls.start(post(server_->url("/"), "lost"), outcome.completion());
+    return eventually([] { return hasUnacknowledged(); });
+  }
+  // The same without a kept connection. Whether one is being made.
+  bool connectInVain(URLSession& urls, Outcome& outcome) {
+    if (!breakTheWay()) return false;
+    urls.start(post(server_->url("/"), "x"), outcome.completion());
+    return eventually([] { return isConnecting(); });
+  }
 
   TestCertificateAuthority authority_;
   std::optional<NetworkNamespace> here_, there_;
@@ -126,7 +147,7 @@ INSTANTIATE_TEST_SUITE_P(Families, KeptConnectionsOffline, testing::Values(kFour
 
 TEST_P(KeptConnectionsOffline, WhatIsPostedWithoutARouteWaitsThoughAConnectionIsKept) {
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   for (const std::string body : {"one", "two"}) {
     ASSERT_TRUE(goAway());
     Outcome outcome, upload;
@@ -136,9 +157,8 @@ TEST_P(KeptConnectionsOffline, WhatIsPostedWithoutARouteWaitsThoughAConnectionIs
     urls->start(std::move(awaited), upload.completion());
     ASSERT_TRUE(waitUntilWaiting(2));
     ASSERT_TRUE(comeBack());
-    ASSERT_TRUE(outcome.wait() && upload.wait());
-    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
-    EXPECT_EQ(upload.status(), 200) << upload.errorText();
+    EXPECT_TRUE(succeeds(outcome));
+    EXPECT_TRUE(succeeds(upload));
     EXPECT_EQ(times(body), 1u);
     EXPECT_EQ(times("upload " + body), 1u);
   }
@@ -146,7 +166,7 @@ TEST_P(KeptConnectionsOffline, WhatIsPostedWithoutARouteWaitsThoughAConnectionIs
 
 TEST_P(KeptConnectionsOffline, WhatIsPostedWithoutARouteFailsInASessionThatDoesNotWait) {
   auto urls = session(false);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   ASSERT_TRUE(goAway());
   EXPECT_EQ(perform(*urls, post(server_->url("/"), "offline")).errorCode(), CURLE_COULDNT_CONNECT);
   EXPECT_EQ(times("offline"), 0u);
@@ -154,7 +174,7 @@ TEST_P(KeptConnectionsOffline, WhatIsPostedWithoutARouteFailsInASessionThatDoesN
 
 TEST_P(KeptConnectionsOffline, WithAnotherAddressNothingGoesOnTheConnectionOfTheFormerOne) {
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   ASSERT_TRUE(move());
   for (int i = 0; i < 3; ++i) {
     const Outcome outcome = perform(*urls, post(server_->url("/"), "after"));
@@ -167,16 +187,13 @@ TEST_P(KeptConnectionsOffline, WithAnotherAddressNothingGoesOnTheConnectionOfThe
 
 TEST_P(KeptConnectionsOffline, WhatWasOnItsWayWhenTheRouteWentAndDidNotArriveWaits) {
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
-  ASSERT_TRUE(breakTheWay());
+  ASSERT_TRUE(arrives(*urls, "before"));
   Outcome outcome;
-  urls->start(post(server_->url("/"), "lost"), outcome.completion());
-  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  ASSERT_TRUE(lose(*urls, outcome));
   ASSERT_TRUE(goAway());
   ASSERT_TRUE(waitUntilWaiting(1)) << "long before it is stuck";
   ASSERT_TRUE(mendTheWay() && comeBack());
-  ASSERT_TRUE(outcome.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(times("lost"), 1u);
 }
 
@@ -195,8 +212,8 @@ TEST_P(KeptConnectionsOffline, WhatTheServerHasIsNotSentAgainAndItsAnswerIsTaken
   EXPECT_EQ(factory().figures().waiting, 1u);
   ASSERT_TRUE(comeBack());
   server_->release();
-  ASSERT_TRUE(outcome.wait() && other.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
+  ASSERT_TRUE(other.wait());
   EXPECT_EQ(times("held"), 1u);
   EXPECT_EQ(times("other"), 1u);
 }
@@ -204,14 +221,13 @@ TEST_P(KeptConnectionsOffline, WhatTheServerHasIsNotSentAgainAndItsAnswerIsTaken
 TEST_P(KeptConnectionsOffline, WhatIsStuckAndDidNotArriveGoesAgainOnANewConnection) {
   options_.noProgressTimeout = 4s;
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   ASSERT_TRUE(breakTheWay());
   Outcome outcome;
   urls->start(post(server_->url("/"), "stuck"), outcome.completion());
   ASSERT_TRUE(eventually([&] { return isConnecting(); }));
   ASSERT_TRUE(mendTheWay());
-  ASSERT_TRUE(outcome.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(times("stuck"), 1u);
   EXPECT_EQ(server_->connectionsAccepted(), 2u);
 }
@@ -236,18 +252,15 @@ TEST_P(KeptConnectionsOffline, WhatIsStuckAndMayHaveArrivedIsReported) {
 constexpr auto kSoon = 15s;
 
 TEST_P(KeptConnectionsOffline, WhatWasAboutToConnectWhenTheRouteWentWaits) {
-  ASSERT_TRUE(breakTheWay());
   auto urls = session(true);
   Outcome outcome;
-  urls->start(post(server_->url("/"), "x"), outcome.completion());
-  ASSERT_TRUE(eventually([&] { return isConnecting(); }));
+  ASSERT_TRUE(connectInVain(*urls, outcome));
   const auto start = std::chrono::steady_clock::now();
   ASSERT_TRUE(goAway());
   ASSERT_TRUE(waitUntilWaiting(1));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   ASSERT_TRUE(mendTheWay() && comeBack());
-  ASSERT_TRUE(outcome.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(times("x"), 1u);
 }
 
@@ -259,21 +272,16 @@ TEST_P(KeptConnectionsOffline, WhatWasAboutToConnectFromAFormerAddressConnectsFr
   ASSERT_TRUE(eventually([&] { return isConnecting(); }));
   const auto start = std::chrono::steady_clock::now();
   ASSERT_TRUE(move() && mendTheWay());
-  for (Outcome& outcome : outcomes) {
-    ASSERT_TRUE(outcome.wait());
-    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
-  }
+  for (Outcome& outcome : outcomes) EXPECT_TRUE(succeeds(outcome));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   EXPECT_EQ(times("x"), 3u);
   EXPECT_EQ(server_->requests().back().peer, family().other);
 }
 
 TEST_P(KeptConnectionsOffline, WhatIsAboutToConnectIsNotDisturbedByChangesElsewhere) {
-  ASSERT_TRUE(breakTheWay());
   auto urls = session(true);
   Outcome outcome;
-  urls->start(post(server_->url("/"), "x"), outcome.completion());
-  ASSERT_TRUE(eventually([&] { return isConnecting(); }));
+  ASSERT_TRUE(connectInVain(*urls, outcome));
   const std::string before = connecting();
   for (int i = 0; i < 5; ++i) {
     ASSERT_TRUE(here_->run("ip addr add 10.90.0.1/32 dev lo && ip addr del 10.90.0.1/32 dev lo"));
@@ -282,8 +290,7 @@ TEST_P(KeptConnectionsOffline, WhatIsAboutToConnectIsNotDisturbedByChangesElsewh
   }
   EXPECT_EQ(connecting(), before);
   ASSERT_TRUE(mendTheWay());
-  ASSERT_TRUE(outcome.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
 }
 
 // A session has eight connections to one server at most.
@@ -301,10 +308,7 @@ TEST_P(KeptConnectionsOffline, WhatHadNoConnectionYetDoesNotWaitForThoseOfAForme
   EXPECT_FALSE(next[0].wait(200ms));
   const auto start = std::chrono::steady_clock::now();
   ASSERT_TRUE(move());
-  for (Outcome& outcome : next) {
-    ASSERT_TRUE(outcome.wait());
-    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
-  }
+  for (Outcome& outcome : next) EXPECT_TRUE(succeeds(outcome));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   EXPECT_EQ(times("held"), 8u);
   EXPECT_EQ(times("next"), 2u);
@@ -314,14 +318,14 @@ TEST_P(KeptConnectionsOffline,
        APostOfWhichAPartHasArrivedWhenTheAddressChangesIsReportedAndTheNextIsNotDelayed) {
   options_.noProgressTimeout = 3s;
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   Outcome cut;
   const std::string large(200u << 20, 'l');  // more than is sent before the address changes
   urls->start(post(server_->url("/"), large), cut.completion());
   ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
   ASSERT_TRUE(move());
   const auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "after")).status(), 200);
+  EXPECT_TRUE(arrives(*urls, "after"));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   ASSERT_TRUE(cut.wait());
   EXPECT_NE(cut.errorCode(), 0);
@@ -348,10 +352,10 @@ INSTANTIATE_TEST_SUITE_P(Families, KeptConnectionsUntold, testing::Values(kFour,
 
 TEST_P(KeptConnectionsUntold, NothingGoesOnTheConnectionOfAFormerAddress) {
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
+  ASSERT_TRUE(arrives(*urls, "before"));
   ASSERT_TRUE(move());
   const auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "after")).status(), 200);
+  EXPECT_TRUE(arrives(*urls, "after"));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   EXPECT_EQ(server_->requests().back().peer, family().other);
 }
@@ -359,18 +363,15 @@ TEST_P(KeptConnectionsUntold, NothingGoesOnTheConnectionOfAFormerAddress) {
 TEST_P(KeptConnectionsUntold, WhatIsOnItsWayIsLookedAtByTheSlowTimer) {
   options_.waitingRetryPeriod = 1s;
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
-  ASSERT_TRUE(breakTheWay());
+  ASSERT_TRUE(arrives(*urls, "before"));
   Outcome outcome;
-  urls->start(post(server_->url("/"), "lost"), outcome.completion());
-  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  ASSERT_TRUE(lose(*urls, outcome));
   const auto start = std::chrono::steady_clock::now();
   ASSERT_TRUE(goAway());
   ASSERT_TRUE(waitUntilWaiting(1));
   EXPECT_LT(std::chrono::steady_clock::now() - start, kSoon);
   ASSERT_TRUE(mendTheWay() && comeBack());
-  ASSERT_TRUE(outcome.wait());
-  EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
+  EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(times("lost"), 1u);
 }
 
@@ -378,11 +379,9 @@ TEST_P(KeptConnectionsUntold, OnceTheKernelCanTellWhatHappenedMeanwhileIsLookedA
   // Or the kernel would tell of these addresses in the middle of it.
   ASSERT_TRUE(eventually([&] { return !here_->run("ip -6 address show tentative | grep -q ."); }));
   auto urls = session(true);
-  EXPECT_EQ(perform(*urls, post(server_->url("/"), "before")).status(), 200);
-  ASSERT_TRUE(breakTheWay());
+  ASSERT_TRUE(arrives(*urls, "before"));
   Outcome lost;
-  urls->start(post(server_->url("/"), "lost"), lost.completion());
-  ASSERT_TRUE(eventually([&] { return hasUnacknowledged(); }));
+  ASSERT_TRUE(lose(*urls, lost));
   ASSERT_TRUE(goAway());
   subscriptionsFail = false;
   auto others = session(true);
@@ -392,8 +391,7 @@ TEST_P(KeptConnectionsUntold, OnceTheKernelCanTellWhatHappenedMeanwhileIsLookedA
                 other.completion());
   ASSERT_TRUE(waitUntilWaiting(1));
   ASSERT_TRUE(mendTheWay() && comeBack());
-  ASSERT_TRUE(lost.wait());
-  EXPECT_EQ(lost.status(), 200) << lost.errorText();
+  EXPECT_TRUE(succeeds(lost));
   EXPECT_EQ(times("lost"), 1u);
 }
 
@@ -422,10 +420,7 @@ TEST_P(KeptHTTP2ConnectionsOffline, WhatIsPostedWithoutARouteWaitsAndArrivesFrom
   for (Outcome& outcome : offline) urls->start(post(nginx_->url(), "offline"), outcome.completion());
   ASSERT_TRUE(waitUntilWaiting(10));
   ASSERT_TRUE(move());
-  for (Outcome& outcome : offline) {
-    ASSERT_TRUE(outcome.wait());
-    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
-  }
+  for (Outcome& outcome : offline) EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(perform(*urls, post(nginx_->url(), "after")).status(), 200);
   EXPECT_EQ(times("offline"), 10u);
 }
@@ -440,10 +435,7 @@ TEST_P(KeptHTTP2ConnectionsOffline, WhatWasOnItsWayAndDidNotArriveGoesAgainFromA
   ASSERT_TRUE(move() && mendTheWay());
   const Outcome after = perform(*urls, post(nginx_->url(), "after"));
   EXPECT_EQ(after.status(), 200) << after.errorText();
-  for (Outcome& outcome : lost) {
-    ASSERT_TRUE(outcome.wait());
-    EXPECT_EQ(outcome.status(), 200) << outcome.errorText();
-  }
+  for (Outcome& outcome : lost) EXPECT_TRUE(succeeds(outcome));
   EXPECT_EQ(times("lost"), 5u);
 }
 
