@@ -16,6 +16,8 @@ namespace {
 
 constexpr std::string_view kIdentifierPrefix = "uuid:";
 constexpr std::string_view kOwnerPrefix = "uuidOwner:";
+constexpr std::string_view kMadePrefix = "uuidMade:";
+constexpr std::string_view kAllIdentifiers = "uuid";  // and what is noted beside them
 
 Error failure(int code, std::string text) {
   return Error{"KYTUserDefaultsErrorDomain", code, std::move(text)};
@@ -28,13 +30,16 @@ std::string identifierOwnedBy(std::string_view ownerKey) {
   return std::string(kIdentifierPrefix).append(ownerKey.substr(kOwnerPrefix.size()));
 }
 
-std::optional<std::string> withOwner(std::string_view text, std::string_view file,
-                                     std::string_view identifier, uint32_t owner) {
+std::optional<std::string> withEntry(std::string_view text, std::string_view file, std::string_view key,
+                                     int64_t value) {
   const auto parsed = parseFlatToml(text, file);
   const auto* content = std::get_if<FlatToml>(&parsed);
   if (content == nullptr) return std::nullopt;
-  const std::string key = std::string(kOwnerPrefix).append(identifier.substr(kIdentifierPrefix.size()));
-  return content->textWith(key, Value(static_cast<long>(owner)));
+  return content->textWith(key, Value(value));
+}
+
+std::string ownerKeyOf(std::string_view identifier) {
+  return std::string(kOwnerPrefix).append(identifier.substr(kIdentifierPrefix.size()));
 }
 
 // Takes the owner and group of `like` as far as this process may; who may not give files away keeps its own.
@@ -171,41 +176,72 @@ std::optional<Error> TomlUserDefaults::refusalOfAnother(const FlatToml& content,
                             std::to_string(*owner) + " already");
 }
 
+bool TomlUserDefaults::isIdentifier(std::string_view key) {
+  return key.starts_with(kAllIdentifiers) && !key.starts_with(kOwnerPrefix) && !key.starts_with(kMadePrefix);
+}
+
+std::string TomlUserDefaults::madeKeyOf(std::string_view key) {
+  return std::string(kMadePrefix).append(key);
+}
+
+std::optional<Error> TomlUserDefaults::removeIdentifiers(std::string_view domainName) {
+  const BlockingScope blocking;
+  const GateLock one(writing_);
+  const std::string domain(domainName);
+  if (!isDomainName(domain)) return failure(EINVAL, "\"" + domain + "\" is no domain name");
+  if (auto error = makeFolders(options_.folder, 0750)) return failure(EIO, *error);
+  auto lock = lockDomain(domain);
+  if (auto* error = std::get_if<Error>(&lock)) return std::move(*error);
+  auto read = contentOf(path(domain, ".toml"));
+  if (auto* error = std::get_if<Error>(&read)) return std::move(*error);
+  const FlatToml& content = std::get<FlatToml>(read);
+  if (content.countWithPrefix(kAllIdentifiers) == 0) return std::nullopt;
+  return replaceFile(domain, content.textWithoutPrefix(kAllIdentifiers));
+}
+
+// Empty where there is no file.
+std::variant<FlatToml, Error> TomlUserDefaults::contentOf(const std::string& file) const {
+  struct stat status = {};
+  if (::lstat(file.c_str(), &status) != 0) {
+    if (errno == ENOENT) return FlatToml();
+    return systemFailure(errno, file);
+  }
+  if (!S_ISREG(status.st_mode)) return failure(EINVAL, file + ": is no regular file");
+  auto contents = readRegularFile(file, kMaxTomlBytes);
+  if (const auto* wrong = std::get_if<ReadProblem>(&contents)) return failure(EIO, file + ": " + wrong->text);
+  auto parsed = parseFlatToml(std::get<FileContents>(contents).bytes, file);
+  if (auto* wrong = std::get_if<TomlError>(&parsed)) return failure(EINVAL, wrong->text);
+  return std::move(std::get<FlatToml>(parsed));
+}
+
 std::variant<Value, Error> TomlUserDefaults::store(std::string_view domainName, std::string_view key,
                                                    Value value, Mode mode, std::optional<uint32_t> owner) {
   const std::string domain(domainName);
   if (!isDomainName(domain)) return failure(EINVAL, "\"" + domain + "\" is no domain name");
-  const bool isIdentifier = key.starts_with(kIdentifierPrefix) && !value.isNull();
-  if (isIdentifier && key.size() > kMaxIdentifierKey)
-    return failure(E2BIG, "the identifier's key is too long");
+  const bool isCustom = key.starts_with(kIdentifierPrefix) && !value.isNull();
+  if (isCustom && key.size() > kMaxIdentifierKey) return failure(E2BIG, "the identifier's key is too long");
   if (auto error = makeFolders(options_.folder, 0750)) return failure(EIO, *error);
   auto lock = lockDomain(domain);
   if (auto* error = std::get_if<Error>(&lock)) return std::move(*error);
   reached("locked");
 
   const std::string file = path(domain, ".toml");
-  FlatToml content;
-  struct stat status = {};
-  if (::lstat(file.c_str(), &status) == 0) {
-    if (!S_ISREG(status.st_mode)) return failure(EINVAL, file + ": is no regular file");
-    auto contents = readRegularFile(file, kMaxTomlBytes);
-    if (const auto* wrong = std::get_if<ReadProblem>(&contents))
-      return failure(EIO, file + ": " + wrong->text);
-    auto parsed = parseFlatToml(std::get<FileContents>(contents).bytes, file);
-    if (auto* wrong = std::get_if<TomlError>(&parsed)) return failure(EINVAL, wrong->text);
-    content = std::move(std::get<FlatToml>(parsed));
-  } else if (errno != ENOENT) {
-    return systemFailure(errno, file);
-  }
+  auto read = contentOf(file);
+  if (auto* error = std::get_if<Error>(&read)) return std::move(*error);
+  const FlatToml& content = std::get<FlatToml>(read);
 
   const Value known = content.value(key);
   if (mode == Mode::keepString && known.string() != nullptr) return known;
   if (value.isNull() && known.isNull()) return value;
-  const bool isNew = isIdentifier && known.isNull();
+  const bool isNew = isCustom && known.isNull();
   if (isNew)
     if (auto error = refusalOfAnother(content, owner)) return std::move(*error);
   auto text = content.textWith(key, value);
-  if (text && isNew && owner) text = withOwner(*text, file, key, *owner);
+  if (text && isNew && owner) text = withEntry(*text, file, ownerKeyOf(key), static_cast<int64_t>(*owner));
+  // Without this note rather than without the identifier.
+  if (text && mode == Mode::keepString && isIdentifier(key))
+    if (auto noted = withEntry(*text, file, madeKeyOf(key), clock_.timeOfDay().seconds))
+      text = std::move(noted);
   if (!text)
     return failure(EINVAL, "such a value or key cannot be stored, or the file would become too large");
   if (auto error = replaceFile(domain, *text)) return std::move(*error);

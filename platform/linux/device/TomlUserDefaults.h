@@ -11,7 +11,8 @@
 // each of its states, and is never overwritten. What the machine refuses for a moment (FlatToml.h) changes nothing but
 // for a line. At most Limits::maxCustomIdentifiers keys "uuid:…" are
 // stored, each of at most kMaxIdentifierKey bytes, since clients choose their names; for one user's clients only some of
-// them. Beside each stands for whom it was made: "uuidOwner:…" with the user's number, in the same replacement.
+// them. Beside each stands for whom it was made: "uuidOwner:…" with the user's number, in the same replacement; and beside
+// every identifier when: "uuidMade:" with its key, in seconds since 1970.
 #pragma once
 
 #include <map>
@@ -56,6 +57,12 @@ class TomlUserDefaults final : public UserDefaults {
 
   // All values of a domain, by key.
   [[nodiscard]] Dictionary values(std::string_view domain) EXCLUDES(mutex_);
+  // The keys under which identifiers of this device stand: "uuidRespectDnu", "uuidOverrideDnu", "uuid:…"; and the key under
+  // which stands when such a one was made and stored, in seconds since 1970.
+  [[nodiscard]] static bool isIdentifier(std::string_view key);
+  [[nodiscard]] static std::string madeKeyOf(std::string_view key);
+  // All of them, with what is noted beside them; in one replacement of the file.
+  [[nodiscard]] std::optional<Error> removeIdentifiers(std::string_view domain) EXCLUDES(writing_);
   // One to 128 of the characters A-Z a-z 0-9 . _ -, not beginning with a point, and nowhere two points in a
   // row.
   [[nodiscard]] static bool isDomainName(std::string_view domain);
@@ -67,6 +74,7 @@ class TomlUserDefaults final : public UserDefaults {
                                    std::optional<uint32_t> owner = std::nullopt) REQUIRES(writing_);
   [[nodiscard]] std::optional<Error> refusalOfAnother(const FlatToml& content,
                                                       std::optional<uint32_t> owner) const;
+  [[nodiscard]] std::variant<FlatToml, Error> contentOf(const std::string& file) const;
   std::optional<Error> replaceFile(const std::string& domain, std::string_view text) REQUIRES(writing_);
   const FlatToml& current(std::string_view domain) REQUIRES(mutex_);
   std::variant<Descriptor, Error> lockDomain(const std::string& domain) REQUIRES(writing_);

@@ -1,8 +1,10 @@
 #include "platform/linux/toml/FlatToml.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <utility>
+#include <vector>
 
 #include "platform/base/TextEscape.h"
 
@@ -96,6 +98,24 @@ std::optional<std::string> FlatToml::textWith(std::string_view key, const Value&
   const size_t others = entries.size() - (found == entries.end() ? 0 : 1);
   if (flat->entries.size() != others + (value.isNull() ? 0 : 1)) return std::nullopt;
   return result;
+}
+
+std::string FlatToml::textWithoutPrefix(std::string_view prefix) const {
+  std::vector<std::pair<uint32_t, uint32_t>> gone;  // from line to line
+  for (auto entry = entries.lower_bound(prefix); entry != entries.end() && entry->first.starts_with(prefix);
+       ++entry)
+    gone.emplace_back(entry->second.line, std::max(entry->second.line, entry->second.lastLine));
+  std::sort(gone.begin(), gone.end());
+  std::string kept;
+  uint32_t line = 1;
+  auto next = gone.begin();
+  for (size_t at = 0; at < text.size(); ++line) {
+    const size_t end = std::min(text.find('\n', at), text.size() - 1) + 1;
+    while (next != gone.end() && next->second < line) ++next;
+    if (next == gone.end() || line < next->first) kept.append(text, at, end - at);
+    at = end;
+  }
+  return kept;
 }
 
 std::variant<FlatToml, TomlError> parseFlatToml(std::string_view text, std::string_view name) {

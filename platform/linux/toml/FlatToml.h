@@ -31,6 +31,8 @@ struct FlatToml {
   // cannot stand in such a file (another kind of value, an unsigned number past 2^63-1, invalid UTF-8) or the
   // text would be too large.
   [[nodiscard]] std::optional<std::string> textWith(std::string_view key, const Value& value) const;
+  // The text without the entries whose keys begin so.
+  [[nodiscard]] std::string textWithoutPrefix(std::string_view prefix) const;
 };
 
 // An error when there is a section, an array or a date: nothing could be answered for those.

@@ -492,5 +492,56 @@ TEST_F(TomlUserDefaultsTest, WhatCouldNotBeOpenedAtFirstIsReadWithoutAChange) {
   EXPECT_EQ(defaults.value(kDomain, "n"), Value(1));
 }
 
+TEST_F(TomlUserDefaultsTest, NotesWhenAnIdentifierWasMade) {
+  auto defaults = make();
+  clock_.setTimeOfDay({1769860800, 0});
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuidRespectDnu", String("one")), "one");
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:b", String("two"), 1000), "two");
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "other", String("three")), "three");
+  clock_.setTimeOfDay({1769860900, 0});
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuidRespectDnu", String("later")), "one");
+  EXPECT_EQ(defaults.value(kDomain, "uuidMade:uuidRespectDnu"), Value(1769860800));
+  EXPECT_EQ(defaults.value(kDomain, "uuidMade:uuid:a:b"), Value(1769860800));
+  EXPECT_TRUE(defaults.value(kDomain, "uuidMade:other").isNull());
+  EXPECT_EQ(defaults.set(kDomain, "uuidRespectDnu", Value()), std::nullopt);
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuidRespectDnu", String("anew")), "anew");
+  EXPECT_EQ(defaults.value(kDomain, "uuidMade:uuidRespectDnu"), Value(1769860900));
+}
+
+TEST_F(TomlUserDefaultsTest, RemovesAllIdentifiersAtOnceAndNothingElse) {
+  const std::string rest = "# a remark\nenvironmentType = 2\n\n\"uui\" = \"x\"\n";
+  folder_.write(kFile, rest);
+  auto defaults = make();
+  EXPECT_EQ(defaults.stringOrStore(kDomain, "uuidRespectDnu", String("one")), "one");
+  for (int i = 0; i < 50; ++i)
+    EXPECT_EQ(defaults.stringOrStore(kDomain, "uuid:a:" + std::to_string(i), String("x"), 1000), "x");
+  EXPECT_EQ(defaults.removeIdentifiers(kDomain), std::nullopt);
+  EXPECT_EQ(text(), rest);
+  EXPECT_TRUE(defaults.value(kDomain, "uuidRespectDnu").isNull());
+  const auto before = identityOf(folder_ / kFile);
+  EXPECT_EQ(defaults.removeIdentifiers(kDomain), std::nullopt);
+  EXPECT_EQ(identityOf(folder_ / kFile), before) << "there was nothing to remove";
+  EXPECT_TRUE(defaults.removeIdentifiers("../etc"));
+}
+
+TEST_F(TomlUserDefaultsTest, RemovesIdentifiersOfAFileWithoutALastLineEnd) {
+  folder_.write(kFile, "\"uuid:a:b\" = \"one\"\nlast = 1\nuuidRespectDnu = \"two\"");
+  EXPECT_EQ(make().removeIdentifiers(kDomain), std::nullopt);
+  EXPECT_EQ(text(), "last = 1\n");
+}
+
+TEST_F(TomlUserDefaultsTest, RemovesNoIdentifiersOfAFileThatIsWrong) {
+  folder_.write(kFile, "uuidRespectDnu = ");
+  EXPECT_TRUE(make().removeIdentifiers(kDomain));
+  EXPECT_EQ(text(), "uuidRespectDnu = ");
+}
+
+TEST(Identifiers, AreToldFromWhatIsNotedBesideThem) {
+  for (const char* key : {"uuidRespectDnu", "uuidOverrideDnu", "uuid:a:b"})
+    EXPECT_TRUE(TomlUserDefaults::isIdentifier(key)) << key;
+  for (const char* key : {"uuidOwner:a:b", "uuidMade:uuid:a:b", "environmentType"})
+    EXPECT_FALSE(TomlUserDefaults::isIdentifier(key)) << key;
+}
+
 }  // namespace
 }  // namespace kyt
