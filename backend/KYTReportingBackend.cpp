@@ -71,6 +71,17 @@ void KYTReportingBackend::setProgram(std::shared_ptr<const ReportingProgram> pro
   program_ = std::move(program);
 }
 
+void KYTReportingBackend::tellOwner(DepartureKind kind, std::string_view address, size_t bytes,
+                                    const URLReply& reply) const {
+  if (!mayHaveLeft(reply.response, reply.error)) return;
+  platform_.departures.add({.program = program_ != nullptr ? *program_ : ReportingProgram(),
+                            .server = std::string(serverOf(address)),
+                            .kind = kind,
+                            .events = 0,
+                            .bytes = bytes,
+                            .isAnswered = reply.response.has_value()});
+}
+
 void KYTReportingBackend::takeEvent(bool isInternal) {
   std::shared_ptr<Tally>& tally = tallies_[isInternal ? 1 : 0];
   if (tally == nullptr && program_ != nullptr)

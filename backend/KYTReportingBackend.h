@@ -24,8 +24,10 @@
 #include "backend/SessionFacts.h"
 #include "backend/SessionIDPath.h"
 #include "platform/FileExtension.h"
+#include "platform/URLSession.h"
 #include "platform/base/Books.h"
 #include "platform/base/Clock.h"
+#include "platform/base/Departures.h"
 #include "platform/base/Error.h"
 #include "platform/base/Function.h"
 #include "platform/base/Mutex.h"
@@ -170,6 +172,8 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   [[nodiscard]] Tally* tally() const { return tally_; }
   void dropEvent(Tally* tally, Reason fate) const;
   void eventDelivered() const;
+  // The answer to the upload of a file or of log data, for the owner of the device. The session's queue.
+  void tellOwner(DepartureKind kind, std::string_view address, size_t bytes, const URLReply& reply) const;
   // Of the latest event.
   [[nodiscard]] uint16_t eventNumber() const { return eventID_; }
   void setEventWhitelist(std::optional<Array> list) { eventWhitelist_ = std::move(list); }

@@ -18,6 +18,7 @@
 #include "platform/linux/confinement/Capabilities.h"
 #include "platform/linux/confinement/LinuxConfinement.h"
 #include "platform/linux/data/MakeDeflate.h"
+#include "platform/linux/device/DepartureFile.h"
 #include "platform/linux/files/Files.h"
 #include "platform/linux/helpers/DeletionBroker.h"
 #include "platform/linux/helpers/ProgramInspector.h"
@@ -36,6 +37,7 @@ namespace {
 constexpr int kCouldNotStart = 1;
 constexpr int kOutOfMemory = 1;
 constexpr int kNotConfined = -1;
+constexpr Duration kErasurePatience = std::chrono::seconds(10);
 constexpr uint32_t kPublicFolder = 0755;   // clients look the socket up in it
 constexpr uint32_t kPrivateFolder = 0750;  // identifiers, and what was sent
 
@@ -156,6 +158,12 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
     log.error("main: Cannot start the reactor");
     return kCouldNotStart;
   }
+  // Whoever erases what the daemon knows keeps it meanwhile.
+  std::string problem;
+  const auto lock = DaemonLock::take(paths.userDefaults(), kErasurePatience, problem);
+  if (!lock) log.error("main: Cannot keep others from erasing: %s", problem.c_str());
+  ErasureMark mark(paths.userDefaults());
+  static_cast<void>(mark.remove());  // of an erasure that was cut off
   log.allowThreads();
   DaemonServices services({.system = {.settings = settings,
                                       .paths = paths,
@@ -186,6 +194,10 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
   else
     log.normal("main: Ending, idle for %g seconds", settings.limits.idleExitSeconds);
   ServiceManager::stopping();
+  if (mark.stands()) {
+    log.normal("main: The owner erases what is known: what waits is not sent");
+    services.endWithoutSending();
+  }
   const bool ended = services.shutDown();
   const int status = reserve.isUsed() ? kOutOfMemory : 0;
   if (!ended) std::_Exit(status);  // threads that do not end use all that would be destroyed here

@@ -68,6 +68,8 @@ DaemonPlatform::DaemonPlatform(Start start)
       fileExtensions(start.broker, start.log, start.counters, budget),
       pluginBundles(start.paths.root, start.log),
       powerLog(start.counters),
+      departures(start.paths.userDefaults(), json, start.log, clock, *reactor,
+                 SerialQueue::create("kyt.departures", workers)),
       ports{
           .limits = start.settings.limits,
           .counters = start.counters,
@@ -94,6 +96,7 @@ DaemonPlatform::DaemonPlatform(Start start)
           .powerLog = powerLog,
           .budget = budget,
           .books = books,
+          .departures = departures,
       } {}
 
 void DaemonPlatform::takeUp(const Settings& settings) {

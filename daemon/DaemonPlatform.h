@@ -24,6 +24,7 @@
 #include "platform/linux/data/OpenSSLCryptography.h"
 #include "platform/linux/data/PugixmlPropertyLists.h"
 #include "platform/linux/data/RapidJSON.h"
+#include "platform/linux/device/DepartureFile.h"
 #include "platform/linux/device/LinuxDeviceProperties.h"
 #include "platform/linux/device/TomlUserDefaults.h"
 #include "platform/linux/entitlements/TomlEntitlements.h"
@@ -82,6 +83,7 @@ struct DaemonPlatform {
   DlopenPluginBundles pluginBundles;
   JournalPowerLog powerLog;
   LinuxFileManager files;
+  DepartureFile departures;
   Platform ports;
 };
 

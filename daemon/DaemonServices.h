@@ -49,6 +49,8 @@ class DaemonServices {
   // under one deadline, and ends all threads. Once, on the main thread. False when threads would not end: then the
   // process must, without destroying this.
   [[nodiscard]] bool shutDown();
+  // The end that the owner asks for, who erases what the daemon knows: nothing is sent any more. Does not return.
+  [[noreturn]] void endWithoutSending();
 
  private:
   class Deadline;

@@ -10,6 +10,7 @@ class Clock;
 class Counters;
 class Cryptography;
 class Deflate;
+class Departures;
 class DeviceProperties;
 class DiagnosticsConsent;
 class Executor;
@@ -55,6 +56,7 @@ struct Platform {
   PowerLog& powerLog;
   UserBudget& budget;
   Books& books;
+  Departures& departures;
 };
 
 }  // namespace kyt

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <iterator>
 #include <utility>
 
 #include "platform/base/Limits.h"
@@ -20,6 +21,16 @@ std::optional<std::string> URLResponse::header(std::string_view name) const {
     all = all ? *all + ", " + value : value;
   }
   return all;
+}
+
+bool mayHaveLeft(const std::optional<URLResponse>& response, const std::optional<Error>& error) {
+  // libcurl's: no such address, no resolver, nobody listens, no common TLS, a certificate or a list of them that is wrong.
+  constexpr int32_t kBeforeTheBody[] = {1,  3,  4,  5,  6,  7,  35, 53, 58, 59,
+                                        60, 66, 77, 80, 82, 83, 90, 91, 96, 98};
+  if (response || !error) return true;
+  if (error->code == kURLErrorWaitingTooMuch || error->code == kURLErrorOutstandingTooMuch) return false;
+  return std::find(std::begin(kBeforeTheBody), std::end(kBeforeTheBody), error->code) ==
+         std::end(kBeforeTheBody);
 }
 
 URLReply startAndWait(URLRequest request, Function<void(URLRequest, URLCompletion)> start) {

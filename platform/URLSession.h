@@ -65,6 +65,9 @@ struct URLResponse {
 // headers what had come by then. The status a server has decided on counts even if its reply breaks off.
 using URLCompletion = Function<void(std::optional<Data>, std::optional<URLResponse>, std::optional<Error>)>;
 
+// Whether something of the body may have left the device: the server answered, or the connection to it was made.
+[[nodiscard]] bool mayHaveLeft(const std::optional<URLResponse>& response, const std::optional<Error>& error);
+
 // What a completion was called with.
 struct URLReply {
   std::optional<Data> data;

@@ -24,6 +24,8 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   request.headers = {{"Content-Type", "application/octet-stream"}};
   request.body = std::move(*body);
   request.account = userAccount();
+  const std::string address = request.url;
+  const size_t bytes = request.body.size();
   const auto poster = connectivityDelegate();
   // Deliberately a success: the session is ending, and its client is not told that something is wrong.
   if (poster == nullptr) {
@@ -34,6 +36,7 @@ bool DashboardBackend::uploadLogData(const Value& logData) {
   const URLReply reply = startAndWait(std::move(request), [&](URLRequest sent, URLCompletion completion) {
     poster->postURLRequestWithCompletionHandler(std::move(sent), std::move(completion));
   });
+  tellOwner(DepartureKind::logData, address, bytes, reply);
   return finishUpload(reply.data, reply.error);
 }
 

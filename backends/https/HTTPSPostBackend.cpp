@@ -311,7 +311,8 @@ std::optional<OutgoingPost> HTTPSPostBackend::newPost(MessageFlag flag, std::opt
                               std::move(completion),
                               PostedEvents(std::move(events), platform().counters),
                               {},
-                              userAccount()}};
+                              userAccount(),
+                              0}};
   if (method && responseCode) post.eventMap = EventMap{*method, *responseCode};
   return post;
 }

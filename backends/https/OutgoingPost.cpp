@@ -15,6 +15,7 @@ void OutgoingPost::send(std::string json) && {
     return;
   }
   request.events = reply.events.events();
+  reply.bytes = request.body.size();
   reply.address = request.url.substr(0, request.url.find('?'));
   poster->postURLRequestWithCompletionHandler(std::move(request), std::move(reply));
 }

@@ -4,6 +4,7 @@
 
 #include "platform/Platform.h"
 #include "platform/base/Clock.h"
+#include "platform/base/Departures.h"
 #include "platform/base/UserBudget.h"
 #include "platform/objects/Keys.h"
 #include "platform/queues/LineLimits.h"
@@ -31,6 +32,7 @@ Reason fateBy(const Error& error) {
 void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> response,
                            std::optional<Error> error) {
   const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
+  tellOwner(response, error);
   const int status = response ? response->status : 0;
   const bool redirected = status >= 300 && status <= 399;
   const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
@@ -48,6 +50,20 @@ void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> respo
                        error->localizedDescription.c_str());
   if (status >= 500 && status <= 599) error = disable(status);
   if (completion) completion(Value(), std::move(error));
+}
+
+// The programs' parts of a message are as large as they have events.
+void PostReply::tellOwner(const std::optional<URLResponse>& response,
+                          const std::optional<Error>& error) const {
+  const std::shared_ptr<const BookedEvents> posted = events.events();
+  if (posted == nullptr || !mayHaveLeft(response, error)) return;
+  for (const auto& [program, count] : posted->programs())
+    platform.departures.add({.program = program,
+                             .server = std::string(serverOf(address)),
+                             .kind = DepartureKind::events,
+                             .events = count,
+                             .bytes = bytes * count / posted->size(),
+                             .isAnswered = response.has_value()});
 }
 
 void PostReply::lose(Reason request, Reason fate) {

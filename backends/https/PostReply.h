@@ -22,10 +22,12 @@ struct PostReply {
   PostedEvents events;  // that are delivered or lost with the message
   std::string address;  // without what a "?" begins
   std::shared_ptr<UserAccount> account;
+  size_t bytes = 0;  // of the body
 
   void operator()(std::optional<Data> data, std::optional<URLResponse> response, std::optional<Error> error);
 
  private:
+  void tellOwner(const std::optional<URLResponse>& response, const std::optional<Error>& error) const;
   void lose(Reason request, Reason fate);
   void tell(int status, Reason request, Reason fate);
   [[nodiscard]] Error disable(int status) const;

@@ -202,9 +202,12 @@ std::optional<URLRequest> UploadBackend::newRequest(std::string_view fileName, D
 }
 
 bool UploadBackend::post(ReportingSessionConnectivityInterface& poster, URLRequest request) {
+  const std::string address = request.url;
+  const size_t bytes = request.body.size();
   const URLReply reply = startAndWait(std::move(request), [&](URLRequest sent, URLCompletion completion) {
     poster.postURLRequestWithCompletionHandler(std::move(sent), std::move(completion));
   });
+  tellOwner(DepartureKind::file, address, bytes, reply);
   Log& log = platform().log;
   if (!reply.data) {
     platform().counters.add(Reason::postFailed);

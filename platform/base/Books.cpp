@@ -140,7 +140,7 @@ std::shared_ptr<Tally> Books::open(const ReportingProgram& program, std::string_
                  isInternal,
                  false};
   MutexLock lock(state_->mutex);
-  return std::make_shared<Tally>(state_, state_->row(std::move(key)));
+  return std::make_shared<Tally>(state_, state_->row(std::move(key)), program);
 }
 
 std::vector<BookRow> Books::snapshot() const {
@@ -158,8 +158,8 @@ std::vector<BookRow> Books::snapshot() const {
 }
 
 // Called by open(), which holds the mutex.
-Tally::Tally(std::shared_ptr<Books::State> state, Books::Row& row)
-    : state_(std::move(state)), row_(row), next_(row.first) {
+Tally::Tally(std::shared_ptr<Books::State> state, Books::Row& row, const ReportingProgram& program)
+    : state_(std::move(state)), row_(row), program_(program), next_(row.first) {
   if (next_ != nullptr) next_->previous_ = this;
   row_.first = this;
 }
@@ -214,6 +214,19 @@ template <typename Operation>
 void BookedEvents::forEachRun(Operation operation) const {
   for (const Run& run : runs_)
     if (run.tally) operation(*run.tally, run.events);
+}
+
+std::vector<std::pair<ReportingProgram, size_t>> BookedEvents::programs() const {
+  std::vector<std::pair<ReportingProgram, size_t>> all;
+  forEachRun([&all](Tally& tally, size_t events) {
+    for (auto& [program, sum] : all)
+      if (program == tally.program()) {
+        sum += events;
+        return;
+      }
+    all.emplace_back(tally.program(), events);
+  });
+  return all;
 }
 
 void BookedEvents::leaveBatch() const {

@@ -90,10 +90,13 @@ class Books {
 class Tally final : public std::enable_shared_from_this<Tally> {
  public:
   // For Books alone.
-  Tally(std::shared_ptr<Books::State> state, Books::Row& row);
+  Tally(std::shared_ptr<Books::State> state, Books::Row& row, const ReportingProgram& program);
   ~Tally();  // what it counted stays in the row
   Tally(const Tally&) = delete;
   Tally& operator=(const Tally&) = delete;
+
+  // Whose events these are. Any thread.
+  [[nodiscard]] const ReportingProgram& program() const { return program_; }
 
   void take() { addByOneWriter(taken_); }
   void enterBatch() { addByOneWriter(batched_); }
@@ -113,6 +116,7 @@ class Tally final : public std::enable_shared_from_this<Tally> {
 
   const std::shared_ptr<Books::State> state_;
   Books::Row& row_;
+  const ReportingProgram program_;
   std::atomic<uint64_t> taken_{0}, batched_{0};
   Tally *next_ = nullptr, *previous_ = nullptr;  // of the same row; guarded by the books' mutex
 };
@@ -127,6 +131,9 @@ class BookedEvents {
 
   void add(Tally* tally, size_t events = 1);  // null: of none
   [[nodiscard]] size_t size() const { return size_; }
+
+  // How many are whose.
+  [[nodiscard]] std::vector<std::pair<ReportingProgram, size_t>> programs() const;
 
   // Of all of them.
   void leaveBatch() const;

@@ -46,6 +46,7 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
       .powerLog = fakes.powerLog,
       .budget = fakes.budget,
       .books = fakes.books,
+      .departures = fakes.departures,
   };
   Configuration configuration{platform, test_.deviceIdentity, test_.environment};
   DefaultBackendFactory factory(configuration, backendTable(configuration));

@@ -13,6 +13,7 @@
 #include "platform/base/UserBudget.h"
 #include "platform/fake/FakeBundle.h"
 #include "platform/fake/FakeConsent.h"
+#include "platform/fake/FakeDepartures.h"
 #include "platform/fake/FakeDeviceProperties.h"
 #include "platform/fake/FakeFileExtensions.h"
 #include "platform/fake/FakePluginBundles.h"
@@ -63,6 +64,7 @@ struct TestPlatform {
   FakeFileExtensions fileExtensions;
   FakePluginBundles pluginBundles;
   FakePowerLog powerLog;
+  FakeDepartures departures;
 
   Platform platform{
       .limits = limits,
@@ -90,6 +92,7 @@ struct TestPlatform {
       .powerLog = powerLog,
       .budget = budget,
       .books = books,
+      .departures = departures,
   };
 
   DeviceIdentity deviceIdentity{platform};

@@ -126,7 +126,8 @@ struct Rehearsal::Parts {
                  .pluginBundles = pluginBundles,
                  .powerLog = powerLog,
                  .budget = budget,
-                 .books = books},
+                 .books = books,
+                 .departures = departures},
         deviceIdentity(platform),
         environment(platform, deviceIdentity, device.hosts),
         configuration{platform, deviceIdentity, environment},
@@ -252,6 +253,7 @@ struct Rehearsal::Parts {
   UserBudget budget;
   Counters counters;
   Books books;
+  NoDepartures departures;
   MemoryLogSink sink;
   Log log{sink, LogLevel::normal};
   ManualClock clock;

@@ -10,6 +10,7 @@
 #include "platform/Platform.h"
 #include "platform/base/Books.h"
 #include "platform/base/Counters.h"
+#include "platform/base/Departures.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
 #include "platform/linux/base/EpollReactor.h"
@@ -66,6 +67,7 @@ struct Machine {
   LinuxFileExtensions fileExtensions{nullptr, log, counters, budget};
   DlopenPluginBundles pluginBundles{"/nonexistent", log};
   JournalPowerLog powerLog{counters};
+  NoDepartures departures;
   Platform platform{
       .limits = limits,
       .counters = counters,
@@ -92,6 +94,7 @@ struct Machine {
       .powerLog = powerLog,
       .budget = budget,
       .books = books,
+      .departures = departures,
   };
   ~Machine() { end(); }
   // Nothing runs any more; what was counted stays.

@@ -73,6 +73,12 @@ struct SimulateOptions {
 // `change`: "show", "grant" or "withdraw".
 [[nodiscard]] int consentCommand(const std::string& root, const std::string& change);
 
+[[nodiscard]] int ownerShowCommand(const std::string& root, bool json);
+// "-": standard output.
+[[nodiscard]] int ownerExportCommand(const std::string& root, const std::string& file);
+// Ends a daemon that runs, so that nothing is written back.
+[[nodiscard]] int ownerEraseCommand(const std::string& root);
+
 // Tells why a client is served (0) or refused (1); 2: that cannot be told.
 [[nodiscard]] int entitlementsCheckCommand(const std::string& root, const CheckOptions& options);
 

@@ -1,5 +1,5 @@
 // kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
-// consent, makes keys, signs and checks storebags.
+// consent, shows and erases what is known of the owner, makes keys, signs and checks storebags.
 #include "platform/linux/cli/CommandLine.h"
 #include "tools/kytctl/Commands.h"
 
@@ -16,6 +16,7 @@ struct Arguments {
   SimulateOptions simulate;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
+  bool json = false;
   int status = 0;
 };
 
@@ -149,6 +150,21 @@ void addDefaults(CLI::App& app, Arguments& a) {
     });
 }
 
+void addOwner(CLI::App& app, Arguments& a) {
+  CLI::App* owner = app.add_subcommand("owner", "What left the device, for its owner");
+  owner->require_subcommand(1);
+  CLI::App* show =
+      owner->add_subcommand("show", "Print what left in the last day, identifiers, and what waits");
+  show->add_flag("--json", a.json, "As one JSON object");
+  show->callback([&a] { a.status = ownerShowCommand(a.connection.root, a.json); });
+  CLI::App* take =
+      owner->add_subcommand("export", "Write all that is kept about it on the device into a file");
+  take->add_option("file", a.document, "The file, JSON; - for standard output")->required();
+  take->callback([&a] { a.status = ownerExportCommand(a.connection.root, a.document); });
+  CLI::App* erase = owner->add_subcommand("erase", "Erase identifiers, local logs and what waits");
+  erase->callback([&a] { a.status = ownerEraseCommand(a.connection.root); });
+}
+
 void addEntitlements(CLI::App& app, Arguments& a) {
   CLI::App* entitlements = app.add_subcommand("entitlements", "Who may connect");
   entitlements->require_subcommand(1);
@@ -212,6 +228,7 @@ int main(int argc, char** argv) {
   addSend(app, arguments);
   addExplain(app, arguments);
   addDefaults(app, arguments);
+  addOwner(app, arguments);
   addEntitlements(app, arguments);
   addStorebag(app, arguments);
   if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;

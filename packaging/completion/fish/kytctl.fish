@@ -67,11 +67,14 @@ complete -c kytctl -n __kytctl_at -a session -d 'Run a scripted session'
 complete -c kytctl -n __kytctl_at -a explain -d 'What becomes of an event'
 complete -c kytctl -n __kytctl_at -a defaults -d 'Read and change user defaults'
 complete -c kytctl -n __kytctl_at -a consent -d 'The consent of the owner'
+complete -c kytctl -n __kytctl_at -a owner -d 'What left the device'
 complete -c kytctl -n __kytctl_at -a entitlements -d 'Who may connect'
 complete -c kytctl -n __kytctl_at -a keys -d 'Keys for signing storebags'
 complete -c kytctl -n __kytctl_at -a storebag -d 'Signed configurations'
 complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'
 complete -c kytctl -n '__kytctl_at consent' -a 'show grant withdraw'
+complete -c kytctl -n '__kytctl_at owner' -a 'show export erase'
+complete -c kytctl -n '__kytctl_at -b owner show' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate'
@@ -101,6 +104,7 @@ complete -c kytctl -n '__kytctl_at -b send' -l category -x -d 'The category of t
 complete -c kytctl -n '__kytctl_at -b send' -l type -x -d 'The type of the event'
 complete -c kytctl -n '__kytctl_at -b send' -l payload -x -d 'A JSON object'
 complete -c kytctl -n '__kytctl_at session' -F
+complete -c kytctl -n '__kytctl_at owner export' -F
 complete -c kytctl -n '__kytctl_at -b defaults write' -l type -x -a 'string integer real boolean' -d 'What the value is'
 complete -c kytctl -n '__kytctl_due 1 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_domains)'
 complete -c kytctl -n '__kytctl_due 2 "defaults read" "defaults write" "defaults delete"' -a '(__kytctl_keys)'

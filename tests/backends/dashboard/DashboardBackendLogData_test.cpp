@@ -197,5 +197,14 @@ TEST_F(LogData, ItsCallerWaitsUntilTheServerHasAnswered) {
   EXPECT_EQ(result, 1);
 }
 
+TEST_F(LogData, ThatLeftIsToldTheOwner) {
+  EXPECT_TRUE(backend_->uploadLogData(entries_));
+  const auto left = platform_.departures.all();
+  ASSERT_EQ(left.size(), 1U);
+  EXPECT_EQ(left[0].kind, DepartureKind::logData);
+  EXPECT_EQ(left[0].server, "https://logs.example.org");
+  EXPECT_EQ(left[0].bytes, poster_->requests[0].body.size());
+}
+
 }  // namespace
 }  // namespace kyt

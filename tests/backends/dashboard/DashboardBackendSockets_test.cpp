@@ -87,6 +87,7 @@ class DashboardSockets : public ::testing::Test {
       .powerLog = fakes_.powerLog,
       .budget = fakes_.budget,
       .books = fakes_.books,
+      .departures = fakes_.departures,
   };
   UDPPeer server_;
   std::shared_ptr<DashboardBackend> backend_;

@@ -5,6 +5,7 @@
 #include <limits>
 
 #include "backend/PayloadCompression.h"
+#include "platform/base/Books.h"
 #include "tests/backends/https/HTTPSFixture.h"
 
 namespace kyt {
@@ -540,6 +541,55 @@ TEST_F(LostPosts, AreToldOnceAMinuteWithStatusAndAddress) {
   flushTwo();
   poster_->answer(4, 200);
   EXPECT_EQ(platform_.sink.count("answered with status"), 3u);
+}
+
+class HTTPSPostBackendOwner : public HTTPSFixture {
+ protected:
+  // A batch of a program's events, posted.
+  void postBatch(uint32_t user, size_t events) {
+    decided();
+    auto program = std::make_shared<ReportingProgram>();
+    program->user = user;
+    program->clientName = "a";
+    backend().setProgram(program);
+    for (size_t i = 0; i < events; ++i) {
+      backend().takeEvent(false);
+      send(5);
+    }
+    backend().flushMessagesWithCompletion(nullptr);
+    platform_.executor.runAll();
+    ASSERT_FALSE(poster_->requests.empty());
+  }
+  std::vector<Departure> left() const { return platform_.departures.all(); }
+};
+
+TEST_F(HTTPSPostBackendOwner, IsToldOfAnAnsweredPost) {
+  postBatch(1000, 3);
+  EXPECT_TRUE(left().empty()) << "nobody knows yet";
+  poster_->answer(0, 503);
+  ASSERT_EQ(left().size(), 1U);
+  const Departure departure = left()[0];
+  EXPECT_EQ(departure.program.user, 1000U);
+  EXPECT_EQ(departure.program.clientName, "a");
+  EXPECT_EQ(departure.server, "https://post.example.org");
+  EXPECT_EQ(departure.kind, DepartureKind::events);
+  EXPECT_EQ(departure.events, 3U);
+  EXPECT_EQ(departure.bytes, poster_->requests[0].body.size());
+  EXPECT_TRUE(departure.isAnswered) << "also where the server refuses it";
+}
+
+TEST_F(HTTPSPostBackendOwner, IsToldOfAPostThatWasCutOffOnItsWay) {
+  postBatch(1000, 2);
+  poster_->fail(0, Error{kKYTURLErrorDomain, 56, "reset"});
+  ASSERT_EQ(left().size(), 1U);
+  EXPECT_EQ(left()[0].events, 2U);
+  EXPECT_FALSE(left()[0].isAnswered);
+}
+
+TEST_F(HTTPSPostBackendOwner, IsNotToldOfAPostThatNeverLeft) {
+  postBatch(1000, 2);
+  poster_->fail(0, Error{kKYTURLErrorDomain, 7, "nobody listens"});
+  EXPECT_TRUE(left().empty());
 }
 
 }  // namespace

@@ -420,5 +420,27 @@ TEST(LastPathComponent, IsWhatStandsBehindTheLastSlash) {
   EXPECT_EQ(lastPathComponent(""), "");
 }
 
+TEST_F(Upload, TellsTheOwnerOfAFileThatLeft) {
+  auto program = std::make_shared<ReportingProgram>();
+  program->user = 1001;
+  backend().setProgram(program);
+  EXPECT_TRUE(upload());
+  const auto left = platform_.departures.all();
+  ASSERT_EQ(left.size(), 1U);
+  EXPECT_EQ(left[0].kind, DepartureKind::file);
+  EXPECT_EQ(left[0].program.user, 1001U);
+  EXPECT_EQ(left[0].server, "https://upload.example.org");
+  EXPECT_EQ(left[0].bytes, poster_->requests[0].body.size());
+  EXPECT_TRUE(left[0].isAnswered);
+}
+
+TEST_F(Upload, TellsTheOwnerNothingOfAFileThatCouldNotLeave) {
+  answer([](URLCompletion& completion) {
+    completion(std::nullopt, std::nullopt, Error{kKYTURLErrorDomain, 6, "no such host"});
+  });
+  EXPECT_TRUE(upload());
+  EXPECT_TRUE(platform_.departures.all().empty());
+}
+
 }  // namespace
 }  // namespace kyt

@@ -290,5 +290,20 @@ TEST(RowsOfBooks, AreDescribedInALine) {
       "in-flight=0 waiting=0 outbox=0 delivered=6 dropped=2 post-failed=2");
 }
 
+TEST(BookedEvents, TellWhoseTheyAre) {
+  Books books;
+  ReportingProgram one, other;
+  one.clientName = "one";
+  other.clientName = "other";
+  const auto first = books.open(one, "httppost", false), second = books.open(other, "httppost", false),
+             own = books.open(one, "httppost", true);
+  BookedEvents events;
+  events.add(own.get());
+  events.add(second.get(), 3);
+  events.add(nullptr);
+  events.add(first.get(), 2);
+  EXPECT_EQ(events.programs(), (std::vector<std::pair<ReportingProgram, size_t>>{{one, 3}, {other, 3}}));
+}
+
 }  // namespace
 }  // namespace kyt

@@ -96,5 +96,16 @@ TEST_F(StartAndWait, IsEndedByTheShutDownLikeAllThatThreadsWaitFor) {
   EXPECT_EQ(reply.error->code, kURLErrorCancelled);
 }
 
+TEST(MayHaveLeft, IsAllThatWasAnsweredOrCutOff) {
+  const auto failed = [](int32_t code) { return Error{kKYTURLErrorDomain, code, "failed"}; };
+  EXPECT_TRUE(mayHaveLeft(URLResponse{503, {}}, std::nullopt));
+  EXPECT_TRUE(mayHaveLeft(URLResponse{200, {}}, failed(56)));
+  for (const int32_t code : {18, 28, 52, 55, 56, static_cast<int>(kURLErrorCancelled)})
+    EXPECT_TRUE(mayHaveLeft(std::nullopt, failed(code))) << code;
+  for (const int32_t code : {6, 7, 35, 60, static_cast<int>(kURLErrorWaitingTooMuch),
+                             static_cast<int>(kURLErrorOutstandingTooMuch)})
+    EXPECT_FALSE(mayHaveLeft(std::nullopt, failed(code))) << code;
+}
+
 }  // namespace
 }  // namespace kyt
