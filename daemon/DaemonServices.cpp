@@ -129,14 +129,15 @@ bool DaemonServices::shutDown() {
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
     listener_.invalidateConnections();
-  // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes.
+  // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes, and a
+  // large batch one that writes and compresses it.
   const bool workersEnd = system_.workers.shutDownWithin(deadline.left() + kCancelGrace);
   // Completions write to the message log and more that is destroyed before the URL sessions are.
   const bool threadsEnd = system_.urlSessions.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
   if (threadsEnd)
     system_.reactor->stop();
   else
-    log_.error("shutDown: Threads still wait for what clients passed, ending without them");
+    log_.error("shutDown: Threads still work or wait for what clients passed, ending without them");
   lineLimits_.finish();
   system_.departures.flush();
   logFigures();

@@ -517,6 +517,59 @@ TEST_F(AttackedDaemon, KeepsItsWorkersFromClientsThatWaitForADownload) {
   expectNothingLost();
 }
 
+// Events without end, of a session whose batches are as large as may be.
+void floodWithEvents(const std::string& path) {
+  PlainClient client(path);
+  if (!client.connected() || !client.shakeHands()) return static_cast<void>(::usleep(50000));
+  client.call(
+      "SetSessionInfo", "a{sv}aa{sv}avb",
+      [](MessageWriter& out) {
+        out.writeDictionary(Dictionary{{kKYTReportingSessionInfoSessionID, 78},
+                                       {kKYTReportingSessionInfoClientType, 20},
+                                       {"BatchEvent", true}});
+        out.writeOptionalDictionary(Dictionary{{"ClientName", "hostile"}, {"ServiceName", "test"}});
+        out.writeOptionalValue(nullptr);
+        out.writeBoolean(false);
+      },
+      false);
+  client.call("StartConfigWithCompletionHandler");
+  static_cast<void>(client.receive());
+  std::string calls;
+  MessageWriter writer(calls);
+  for (uint32_t serial = 10; calls.size() < 60000; ++serial) {
+    writer.beginCall(serial, {.path = "/com/vantu/kytreportingd",
+                              .member = "SendMessageWithDictionary",
+                              .signature = "a{sv}",
+                              .expectsReply = false});
+    writer.writeDictionary(Dictionary{{kKYTReportingMessageParametersCategory, 9},
+                                      {kKYTReportingMessageParametersType, 1},
+                                      {kKYTReportingMessageParametersPayload, Dictionary{{"n", 1}}}});
+    static_cast<void>(writer.end());
+  }
+  for (int i = 0; i < 500 && client.send(calls); ++i) {
+  }
+}
+
+// What it holds of the flood's events then takes long to be written and compressed.
+TEST_F(AttackedDaemon, EndsInTimeUnderAFloodOfEventsAndPostsWhatOthersLeftWithIt) {
+  constexpr std::chrono::seconds kGrace(5), kAtTheLatest(8);
+  start("");
+  if (IsSkipped()) return;
+  static_cast<void>(eventsOfTheVictim("alone"));
+  std::vector<std::unique_ptr<Attacker>> attackers;
+  for (int i = 0; i < 3; ++i) attackers.push_back(std::make_unique<Attacker>(socket(), floodWithEvents));
+  ASSERT_TRUE(attackers.front()->isDone(std::chrono::seconds(60)));
+  static_cast<void>(eventsOfTheVictim("attacked"));
+  const auto begin = std::chrono::steady_clock::now();
+  EXPECT_EQ(stage_->stopDaemon(std::chrono::seconds(60)).value_or(-1), 0) << daemonLog();
+  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+  std::printf("it ended in %.2f s\n", seconds);
+  // The system takes its memory back for a while after that, the longer the busier it is.
+  EXPECT_LT(seconds, std::chrono::duration<double>(kGrace + kAtTheLatest).count() + (kSanitized ? 30 : 10));
+  EXPECT_FALSE(logged("Not ended in time")) << daemonLog();
+  EXPECT_TRUE(arrive("client=victim&method=" + std::to_string(kCategory), sent_)) << daemonLog();
+}
+
 TEST_F(AttackedDaemon, KeepsItsTimeFromProgramsThatMayNotConnect) {
   start("");
   if (IsSkipped()) return;
