@@ -284,6 +284,34 @@ TYPED_TEST(URLSessionContract, RefusesWhatWouldMakeTooMuchOutstanding) {
   EXPECT_EQ(this->factory().figures().refused, 1u);
 }
 
+// Single messages of all users share one session.
+TYPED_TEST(URLSessionContract, RefusesInASharedSessionTheUserOfWhomTooMuchIsOutstandingThereAlone) {
+  UserBudget budget(UserShares::of(Limits(), uint64_t{16} << 30, 4096));
+  auto urls = this->factory().create({});
+  const std::string piece(Limits::maxOutstandingBytes / 16, 'x');
+  const auto start = [&](uint32_t user, Outcome& outcome) {
+    URLRequest request = this->request(piece);
+    request.account = budget.account(user);
+    urls->start(std::move(request), outcome.completion());
+  };
+  std::vector<Outcome> admitted(15);
+  for (Outcome& outcome : admitted) start(1, outcome);
+  Outcome refused;
+  start(1, refused);
+  ASSERT_TRUE(refused.wait());
+  EXPECT_EQ(refused.errorCode(), kURLErrorOutstandingTooMuch);
+  std::vector<Outcome> ofAnother(3);
+  for (Outcome& outcome : ofAnother) start(2, outcome);
+  this->implementation_.answerAll();
+  for (const std::vector<Outcome>* outcomes : {&admitted, &ofAnother})
+    for (const Outcome& outcome : *outcomes) {
+      ASSERT_TRUE(outcome.wait());
+      EXPECT_EQ(outcome.errorText(), "");
+    }
+  EXPECT_TRUE(this->drained());
+  EXPECT_EQ(this->factory().figures().refused, 1u);
+}
+
 TYPED_TEST(URLSessionContract, RefusesTheUserOfWhomTooMuchIsOutstanding) {
   Limits limits;
   limits.maxBytesPerUser = 3u << 20;
