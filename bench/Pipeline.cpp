@@ -17,7 +17,9 @@ constexpr uint16_t kCategory = 7;
 
 }  // namespace
 
-Pipeline::Pipeline() {
+Pipeline::Pipeline() : Pipeline(corpusPayloads(kEvents)) {}
+
+Pipeline::Pipeline(const std::vector<Dictionary>& payloads) {
   test_.log.setLevel(LogLevel::error);
   test_.deviceProperties.setCountryCode("DE");
   pipe_->credentials.uid = geteuid();
@@ -38,7 +40,7 @@ Pipeline::Pipeline() {
   receive();
   const std::optional<Array> states = session_ ? session_->fetchReportingStates() : std::nullopt;
   live_ = states && !states->empty();
-  for (const Dictionary& payload : corpusPayloads(kEvents)) appendEventCall(calls_, 1000, kCategory, payload);
+  for (const Dictionary& payload : payloads) appendEventCall(calls_, 1000, kCategory, payload);
   if (live_) discardBatch();
 }
 
@@ -63,6 +65,15 @@ void Pipeline::receive() {
 void Pipeline::fillBatch() {
   pipe_->toServer = calls_;
   receive();
+}
+
+size_t Pipeline::postBatch() {
+  test_.deflate.faults.noStream = true;
+  static_cast<void>(
+      session_->backendForKey(kKYTReportingBackendHTTPPost)->flushMessagesWithCompletion(nullptr));
+  test_.executor.runAll();
+  const size_t requests = test_.urlSessions.requestCount();
+  return requests == 0 ? 0 : test_.urlSessions.lastRequest().body.size();
 }
 
 void Pipeline::discardBatch() {

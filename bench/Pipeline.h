@@ -1,6 +1,6 @@
 // The road of one event in one process, without sockets: the bytes of calls go through a real connection, the
 // session and the HTTPS back end with the benchmarks' storebag, and end in its batch. Used by the benchmarks
-// of a batched event and of its allocations. Everything runs on the calling thread; fakes stand in for the
+// of a batched event, of its allocations, and of the fields of wide ones. Everything runs on the calling thread; fakes stand in for the
 // clock, the user defaults and the network.
 #pragma once
 
@@ -20,6 +20,8 @@ class Pipeline final : private ListenerDelegate {
   static constexpr size_t kEvents = 48;  // of one batch, which none of them flushes
 
   Pipeline();
+  // A batch is made of events of these payloads.
+  explicit Pipeline(const std::vector<Dictionary>& payloads);
   ~Pipeline() override;
   Pipeline(const Pipeline&) = delete;
   Pipeline& operator=(const Pipeline&) = delete;
@@ -27,6 +29,8 @@ class Pipeline final : private ListenerDelegate {
   [[nodiscard]] bool isLive() const { return live_; }
   // One batch's events reach the daemon with one read.
   void fillBatch();
+  // Posts the batch as it is, since there is no compressor. The bytes of the message's text.
+  [[nodiscard]] size_t postBatch();
   // Gives the batch up.
   void discardBatch();
   // What the events in the batch take by the health report's estimate.
