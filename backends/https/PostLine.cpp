@@ -5,6 +5,11 @@
 namespace kyt {
 
 void PostLine::add(Function<void()> post) {
+  if (executor_.hasMuchReady()) {
+    finish();
+    post();
+    return;
+  }
   if (queue_ == nullptr) {
     // A worker for it counts among those of the user whose connection this is.
     queue_ = SerialQueue::create("kyt.post", executor_, SerialQueue::ownerOfThread());

@@ -3,7 +3,8 @@
 // their order. Used by HTTPSPostBackend, on its session's queue.
 //
 // A post holds all that it needs and nothing of the back end. At most `kMostWaiting` wait; who comes with another first does
-// that work itself, or waits for it. The owner finishes the line before its session ends, so that nothing is under way that
+// that work itself, or waits for it. Where many sessions are at work, all processors are, and each does its posts itself:
+// what waits would only be held longer. The owner finishes the line before its session ends, so that nothing is under way that
 // neither a session nor a request counts.
 #pragma once
 
@@ -26,7 +27,7 @@ class PostLine {
   PostLine(const PostLine&) = delete;
   PostLine& operator=(const PostLine&) = delete;
 
-  // Runs it on another thread, after those that were added before.
+  // Runs it after those that were added before, on another thread where one is soon free, else at once.
   void add(Function<void()> post);
   // Returns when all that was added has run. What has not begun runs on the caller's thread.
   void finish();

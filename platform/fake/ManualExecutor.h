@@ -3,6 +3,7 @@
 // destruction, or submitted after shutDown(), is destroyed unrun, as with the worker pool.
 #pragma once
 
+#include <atomic>
 #include <deque>
 #include <memory>
 
@@ -20,6 +21,8 @@ class ManualExecutor final : public Executor {
   bool runOne();    // one queue's turn; false when none waits
   size_t runAll();  // until none waits; how many turns that took
   [[nodiscard]] size_t pending() const;
+  [[nodiscard]] bool hasMuchReady() override { return muchReady_; }
+  void setMuchReady(bool value) { muchReady_ = value; }
   void shutDown();
 
  private:
@@ -27,6 +30,7 @@ class ManualExecutor final : public Executor {
   mutable Mutex mutex_;
   std::deque<std::shared_ptr<SerialQueue>> queues_ GUARDED_BY(mutex_);
   bool shutDown_ GUARDED_BY(mutex_) = false;
+  std::atomic<bool> muchReady_{false};
 };
 
 }  // namespace kyt

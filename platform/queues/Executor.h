@@ -19,6 +19,9 @@ class Executor {
   // Whether a thread of somebody else may run a queue of this executor now, in place of submit(). If so it
   // calls giveBack() afterwards; a shut-down waits for that.
   [[nodiscard]] virtual bool borrow() { return false; }
+  // Whether so much is ready that what is submitted now begins only after others have: who could do it himself should.
+  // Any thread; never blocks. Out of date at once.
+  [[nodiscard]] virtual bool hasMuchReady() { return false; }
   virtual void giveBack() {}
 };
 

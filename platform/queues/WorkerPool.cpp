@@ -66,6 +66,7 @@ class WorkerPool::Implementation {
   void unblock(Worker& self);
   [[nodiscard]] bool borrow();
   void giveBack();
+  [[nodiscard]] bool hasMuchReady();
   [[nodiscard]] WorkerPoolFigures figures();
 
  private:
@@ -368,6 +369,11 @@ void WorkerPool::Implementation::giveBack() {
   if (--borrowed_ == 0 && stopping_) allEnded_.notifyAll();
 }
 
+bool WorkerPool::Implementation::hasMuchReady() {
+  MutexLock lock(mutex_);
+  return ready_.size() >= options_.runnable;
+}
+
 bool WorkerPool::Implementation::shutDown(MonotonicTime end) {
   std::vector<Worker*> sleepers;
   {
@@ -427,6 +433,9 @@ bool WorkerPool::borrow() {
 }
 void WorkerPool::giveBack() {
   implementation_->giveBack();
+}
+bool WorkerPool::hasMuchReady() {
+  return implementation_->hasMuchReady();
 }
 void WorkerPool::stopInsisting() {
   implementation_->stopInsisting();

@@ -50,6 +50,8 @@ class WorkerPool final : public Executor {
   ~WorkerPool() override;  // shutDown()
   void submit(std::shared_ptr<SerialQueue> queue) override;
   [[nodiscard]] bool borrow() override;
+  // As many queues as may run at once.
+  [[nodiscard]] bool hasMuchReady() override;
   void giveBack() override;
   // From now on whoever submits does not wait for a thread that the system refuses: what is ready waits until
   // tryAgain(), which the caller then owes, or the next submission finds one.

@@ -44,6 +44,18 @@ TEST_F(PostLineTest, LetsNoMoreThanTwoWait) {
   EXPECT_EQ(done_, (std::vector<int>{1, 2, 3}));
 }
 
+TEST_F(PostLineTest, RunsAPostAtOnceAndAfterThoseBeforeWhereOthersWaitForThreads) {
+  executor_.setMuchReady(true);
+  line_.add(note(1));
+  EXPECT_EQ(done_, std::vector<int>{1});
+  executor_.setMuchReady(false);
+  line_.add(note(2));
+  EXPECT_EQ(done_, std::vector<int>{1});
+  executor_.setMuchReady(true);
+  line_.add(note(3));
+  EXPECT_EQ(done_, (std::vector<int>{1, 2, 3}));
+}
+
 TEST_F(PostLineTest, FinishesOnTheCallersThreadWhatHasNotBegun) {
   line_.finish();
   const auto caller = std::this_thread::get_id();

@@ -420,6 +420,35 @@ TEST(WorkerPool, LetsAQueueWithEndlessWorkTakeTurnsWithOthers) {
   pool.shutDown();
 }
 
+TEST(WorkerPool, SaysWhenAsManyQueuesAreReadyAsMayRun) {
+  WorkerPoolOptions options;
+  options.runnable = 2;
+  WorkerPool pool(options);
+  EXPECT_FALSE(pool.hasMuchReady());
+  std::atomic<bool> release{false};
+  std::atomic<int> running{0}, ended{0};
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  const auto add = [&] {
+    queues.push_back(SerialQueue::create("test", pool));
+    queues.back()->async([&] {
+      ++running;
+      while (!release) std::this_thread::yield();
+      ++ended;
+    });
+  };
+  add();
+  add();
+  ASSERT_TRUE(eventually([&] { return running == 2; }));
+  EXPECT_FALSE(pool.hasMuchReady()) << "they run";
+  add();
+  EXPECT_FALSE(pool.hasMuchReady());
+  add();
+  EXPECT_TRUE(pool.hasMuchReady());
+  release = true;
+  ASSERT_TRUE(eventually([&] { return ended == 4; }));
+  EXPECT_FALSE(pool.hasMuchReady());
+}
+
 TEST(WorkerPool, EndsAllIdleWorkersAndStartsAgain) {
   WorkerPool pool(options(4, 512, 20ms));
   for (int round = 0; round < 2; ++round) {
