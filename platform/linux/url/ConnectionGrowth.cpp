@@ -14,9 +14,7 @@ constexpr Duration kMostPatience = std::chrono::seconds(1);
 ConnectionGrowth::ConnectionGrowth(NetworkTools& tools, Callbacks callbacks)
     : tools_(tools),
       callbacks_(std::move(callbacks)),
-      patience_(
-          tools.deadlines, [](void* growth) { static_cast<ConnectionGrowth*>(growth)->patienceOver(); },
-          this) {}
+      patience_(Deadline::calling<&ConnectionGrowth::patienceOver>(tools.deadlines, *this)) {}
 
 void ConnectionGrowth::wait(URLTransfer& transfer) {
   if (std::exchange(transfer.isUnbegun, true)) return;

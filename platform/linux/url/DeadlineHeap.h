@@ -13,12 +13,15 @@ namespace kyt {
 
 class DeadlineHeap;
 
-// One deadline. `fire` runs once when it has passed, with the deadline no longer set; it may set it again,
+// One deadline. `fire`, a member function of the owner, runs once when it has passed, with the deadline no longer set; it may set it again,
 // set or cancel others, and destroy the owner.
 class Deadline {
  public:
-  Deadline(DeadlineHeap& heap, void (*fire)(void* owner), void* owner)
-      : heap_(heap), fire_(fire), owner_(owner) {}
+  template <auto fire, typename Owner>
+  [[nodiscard]] static Deadline calling(DeadlineHeap& heap, Owner& owner) {
+    return Deadline(
+        heap, [](void* at) { (static_cast<Owner*>(at)->*fire)(); }, &owner);
+  }
   ~Deadline() { cancel(); }
   Deadline(const Deadline&) = delete;
   Deadline& operator=(const Deadline&) = delete;
@@ -29,6 +32,8 @@ class Deadline {
  private:
   friend class DeadlineHeap;
   static constexpr size_t kNotSet = static_cast<size_t>(-1);
+  Deadline(DeadlineHeap& heap, void (*fire)(void* owner), void* owner)
+      : heap_(heap), fire_(fire), owner_(owner) {}
   DeadlineHeap& heap_;
   void (*fire_)(void*);
   void* owner_;

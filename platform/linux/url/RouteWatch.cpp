@@ -14,10 +14,8 @@ constexpr Duration kSettleTime = std::chrono::milliseconds(50);
 RouteWatch::RouteWatch(NetworkTools& tools, Callbacks callbacks)
     : tools_(tools),
       callbacks_(std::move(callbacks)),
-      settle_(
-          tools.deadlines, [](void* watch) { static_cast<RouteWatch*>(watch)->callbacks_.settled(); }, this),
-      slow_(
-          tools.deadlines, [](void* watch) { static_cast<RouteWatch*>(watch)->slowTimerFired(); }, this) {}
+      settle_(Deadline::calling<&RouteWatch::settled>(tools.deadlines, *this)),
+      slow_(Deadline::calling<&RouteWatch::slowTimerFired>(tools.deadlines, *this)) {}
 
 void RouteWatch::listen() {
   if (!slow_.isSet()) slow_.set(tools_.now + tools_.options.waitingRetryPeriod);

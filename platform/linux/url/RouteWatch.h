@@ -38,6 +38,7 @@ class RouteWatch {
 
  private:
   void noteChange();
+  void settled() { callbacks_.settled(); }
   void slowTimerFired();
 
   NetworkTools& tools_;

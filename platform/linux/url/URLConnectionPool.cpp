@@ -41,16 +41,8 @@ URLConnectionPool::URLConnectionPool(URLRequests& requests, NetworkTools& tools,
       growth_(tools,
               {[this](long most) { curl_.multiSetOption(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, most); },
                [this](URLTransfer& transfer) { lookAgain(transfer); }, [this] { return isConnecting(); }}),
-      timer_(
-          tools.deadlines, [](void* pool) { static_cast<URLConnectionPool*>(pool)->timerExpired(); }, this),
-      idle_(
-          tools.deadlines,
-          [](void* pool) {
-            auto* idle = static_cast<URLConnectionPool*>(pool);
-            idle->requests_.pools().idle().remove(*idle);
-            idle->requests_.closePool(idle->session_, idle->number_);
-          },
-          this) {
+      timer_(Deadline::calling<&URLConnectionPool::timerExpired>(tools.deadlines, *this)),
+      idle_(Deadline::calling<&URLConnectionPool::closeWhenIdle>(tools.deadlines, *this)) {
   if (multi_ == nullptr) return;
   curl_.multiSetOption(multi_, CURLMOPT_SOCKETFUNCTION, socketChanged);
   curl_.multiSetOption(multi_, CURLMOPT_SOCKETDATA, this);
@@ -281,6 +273,11 @@ void URLConnectionPool::timerExpired() {
   int running = 0;
   curl_.multiSocketAction(multi_, CURL_SOCKET_TIMEOUT, 0, &running);
   finishEnded();
+}
+
+void URLConnectionPool::closeWhenIdle() {
+  requests_.pools().idle().remove(*this);
+  requests_.closePool(session_, number_);
 }
 
 void URLConnectionPool::socketReady(int socket, uint32_t events) {

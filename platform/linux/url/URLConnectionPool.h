@@ -70,6 +70,7 @@ class URLConnectionPool {
   [[nodiscard]] CURL* takeHandle();
   [[nodiscard]] bool mayResume(const URLTransfer& transfer);
   void timerExpired();
+  void closeWhenIdle();
   void finishEnded();
 
   URLRequests& requests_;

@@ -27,9 +27,7 @@ MonotonicTime currentTime() {
 URLNetwork::URLNetwork(CurlURLSessionOptions options, Log& log, Counters& counters)
     : tools_(std::move(options), log, counters),
       requests_(tools_, completions_),
-      rest_(
-          tools_.deadlines, [](void* network) { static_cast<URLNetwork*>(network)->tools_.sockets.wake(); },
-          this) {}
+      rest_(Deadline::calling<&URLNetwork::wakeSockets>(tools_.deadlines, *this)) {}
 
 void URLNetwork::start(std::shared_ptr<URLTransfer> transfer) {
   tools_.figures.add(&URLFigures::started);

@@ -63,6 +63,7 @@ class URLNetwork {
   [[nodiscard]] int waitingTime() const;
   void handleEvent(uint64_t which, uint32_t events);
   void takeCommands();
+  void wakeSockets() { tools_.sockets.wake(); }
 
   // Self-synchronised.
   std::atomic<size_t> outstanding_{0};

@@ -35,13 +35,11 @@ URLRequests::URLRequests(NetworkTools& tools, Completions& completions)
                        },
                        [this](const URLTransfer& transfer) { return canLeave(transfer); }}),
       ends_(*this, tools, pools_, routes_),
-      quiet_(
-          tools.deadlines,
-          [](void* owner) {
-            const auto* requests = static_cast<URLRequests*>(owner);
-            if (requests->sessions_.empty()) requests->tools_.options.whenQuiet();
-          },
-          this) {}
+      quiet_(Deadline::calling<&URLRequests::beQuiet>(tools.deadlines, *this)) {}
+
+void URLRequests::beQuiet() {
+  if (sessions_.empty()) tools_.options.whenQuiet();
+}
 
 void URLRequests::begin(std::shared_ptr<URLTransfer> transfer) {
   URLTransfer& begun = *transfer;

@@ -66,6 +66,7 @@ class URLRequests {
   void unlistIfUnused(URLSessionState& session);
   void cancelThose(bool onlyAwaited);
   void routesSettled();
+  void beQuiet();
 
   std::atomic<bool> noneWanted_{false}, noneAwaitedWanted_{false};  // self-synchronised
 

@@ -26,18 +26,16 @@ URLTransfer::URLTransfer(std::shared_ptr<URLSessionState> state, OutstandingByte
       user(itsUser),
       refusal(refused),
       request(std::move(wanted)),
-      deadline(
-          session->network->tools().deadlines,
-          [](void* transfer) {
-            auto* expired = static_cast<URLTransfer*>(transfer);
-            expired->session->network->requests().ends().deadlinePassed(*expired);
-          },
-          this),
+      deadline(Deadline::calling<&URLTransfer::deadlinePassed>(session->network->tools().deadlines, *this)),
       completion_(std::move(completion)),
       reply_(itsUser) {}
 
 void URLTransfer::cancel() {
   session->network->cancel(shared_from_this());
+}
+
+void URLTransfer::deadlinePassed() {
+  session->network->requests().ends().deadlinePassed(*this);
 }
 
 void URLTransfer::deliver() {

@@ -106,6 +106,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   Deadline deadline;
 
  private:
+  void deadlinePassed();
   static size_t receiveHeader(char* bytes, size_t size, size_t count, void* transfer);
   static size_t receiveBody(char* bytes, size_t size, size_t count, void* transfer);
   static int beginOn(void* transfer, char* peer, char* local, int peerPort, int localPort);

@@ -13,10 +13,7 @@ using namespace std::chrono_literals;
 struct Fixture : testing::Test {
   struct Entry {
     Entry(DeadlineHeap& heap, std::vector<int>& firedList, int n)
-        : fired(firedList),
-          number(n),
-          deadline(
-              heap, [](void* entry) { static_cast<Entry*>(entry)->fire(); }, this) {}
+        : fired(firedList), number(n), deadline(Deadline::calling<&Entry::fire>(heap, *this)) {}
     void fire() { fired.push_back(number); }
     std::vector<int>& fired;
     int number;
