@@ -11,7 +11,8 @@
 // body over `Limits::maxHTTPReplyBytes` is an error.
 #pragma once
 
-#include <atomic>
+#include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -53,6 +54,11 @@ struct URLRequest {
   std::shared_ptr<const BookedEvents> events;  // what is told when it begins and ceases to wait; null: nobody
 };
 
+// What a request counts towards what is outstanding, in bytes: header lines, body, and what keeping any request costs.
+// At most half of `Limits::maxOutstandingBytes`, so that a large upload, which has a limit of its own, neither fails
+// for its size nor shuts out what is posted meanwhile.
+[[nodiscard]] size_t countedBytes(const URLRequest& request);
+
 struct URLResponse {
   int status = 0;
   // Of the last response, in order, names as received.
@@ -83,46 +89,6 @@ struct URLSessionConfiguration {
   std::string sourceApplication;  // sent as X-KYT-Source-Application; empty: not sent
   // A request that cannot leave (no route, no resolver) waits for the network.
   bool waitsForConnectivity = false;
-};
-
-// What the requests of one session that have not completed count, for those who implement the port: each user's apart,
-// towards Share::requestBytes and towards what the user may hold in all. Any thread.
-class OutstandingBytes {
- public:
-  class User {
-   public:
-    explicit User(std::shared_ptr<UserAccount> account) : account_(std::move(account)) {}
-    // Whether there was room; then it counts until it is given back.
-    [[nodiscard]] bool take(size_t bytes);
-    void giveBack(size_t bytes);
-    // A reply's body, towards what the user may hold in all alone.
-    [[nodiscard]] bool takeReply(size_t bytes);
-    void giveReplyBack(size_t bytes);
-    // The most that may wait for a network.
-    [[nodiscard]] size_t mostWaiting() const;
-    // Of the queue that runs its completions (SerialQueue): 0 for the daemon's own.
-    [[nodiscard]] uint64_t owner() const;
-
-   private:
-    friend class OutstandingBytes;
-    [[nodiscard]] size_t most() const;
-    const std::shared_ptr<UserAccount> account_;
-    std::atomic<size_t> bytes_{0};
-    User* next_ = nullptr;
-  };
-
-  OutstandingBytes() = default;
-  ~OutstandingBytes();
-  OutstandingBytes(const OutstandingBytes&) = delete;
-  OutstandingBytes& operator=(const OutstandingBytes&) = delete;
-  // The same one each time; it lives as long as this. Mostly there is one: most sessions serve one client.
-  [[nodiscard]] User& user(const std::shared_ptr<UserAccount>& account);
-  // Header lines, body, and what keeping any request costs. One counts at most half of the limit, so that a large
-  // upload, which has a limit of its own, neither fails for its size nor shuts out what is posted meanwhile.
-  [[nodiscard]] static size_t of(const URLRequest& request);
-
- private:
-  std::atomic<User*> first_{nullptr};
 };
 
 // A handle to a request that was started; dropping it changes nothing.

@@ -5,6 +5,7 @@
 #include <mutex>
 
 #include "platform/base/Books.h"
+#include "platform/base/OutstandingBytes.h"
 #include "platform/queues/SerialQueue.h"
 
 namespace kyt {
@@ -38,7 +39,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
   size_t start(Entry entry, bool refused) {
     Responder responder;
     size_t index = 0;
-    const size_t charge = OutstandingBytes::of(entry.request);
+    const size_t charge = countedBytes(entry.request);
     const bool tooMuch = !refused && !entry.outstanding->user(entry.request.account).take(charge);
     if (!refused && !tooMuch) entry.charge = charge;
     {

@@ -11,7 +11,7 @@ class CurlURLSession final : public URLSession {
   ~CurlURLSession() override { CurlURLSession::finishTasksAndInvalidate(); }
 
   std::shared_ptr<URLTask> start(URLRequest request, URLCompletion completion) override {
-    const size_t charge = OutstandingBytes::of(request);
+    const size_t charge = countedBytes(request);
     OutstandingBytes::User& user = state_->outstanding.user(request.account);
     const bool hasRoom = user.take(charge);
     if (!hasRoom) request = {};  // it is not kept until its completion has run

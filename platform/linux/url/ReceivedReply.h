@@ -7,6 +7,7 @@
 #include <string_view>
 
 #include "platform/URLSession.h"
+#include "platform/base/OutstandingBytes.h"
 
 namespace kyt {
 

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/URLSession.h"
+#include "platform/base/OutstandingBytes.h"
 #include "platform/linux/url/LinkedList.h"
 #include "platform/linux/url/URLConnectionPool.h"
 #include "platform/linux/url/URLTransfer.h"

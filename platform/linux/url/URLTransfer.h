@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/URLSession.h"
+#include "platform/base/OutstandingBytes.h"
 #include "platform/linux/url/DeadlineHeap.h"
 #include "platform/linux/url/HeaderLines.h"
 #include "platform/linux/url/LinkedList.h"
