@@ -9,6 +9,9 @@
 // read there without it, and elsewhere only while holding it; those of the last group are touched on the
 // connection's queue alone.
 //
+// What a client, the agent, back ends and other sessions of the hierarchy ask of it is a contract, and most of it reads
+// and writes the same states; so it is one class with more operations and fields than others have.
+//
 // Defined in several files by subject: ReportingdSession.cpp (lifecycle and configuration), …_Routing.cpp
 // (the two doors for messages), …_Flush.cpp (flush, uploads, log data), …_States.cpp (states, hierarchy,
 // aggregation).

@@ -269,7 +269,7 @@ class KYT_OBJECT Dictionary {
   detail::Block* block_ = nullptr;
 };
 
-// Any of them, or nothing (null: a missing object).
+// Any of them, or nothing (null: a missing object). Many functions, since each kind has a constructor and readers.
 class KYT_OBJECT Value {
  public:
   enum class Kind : uint8_t {

@@ -168,7 +168,8 @@ using LevelAllocator = rapidjson::MemoryPoolAllocator<>;
 using PrettyBase =
     rapidjson::PrettyWriter<JSONTextStream, rapidjson::UTF8<>, rapidjson::UTF8<>, LevelAllocator>;
 
-// RapidJSON's writer for objects. Punctuation is its own; texts are copied by words.
+// The text for people (kytctl shows storebags): indentation and punctuation stay RapidJSON's own. CompactWriter does
+// without that library's writer, for whose state at each level every event would pay.
 class PrettyObjectWriter : public PrettyBase {
  public:
   PrettyObjectWriter(JSONTextStream& stream, LevelAllocator& allocator)
