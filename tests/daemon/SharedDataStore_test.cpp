@@ -11,10 +11,14 @@ namespace {
 
 constexpr uint32_t kOne = 1, kTwo = 2;
 
-TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
+UserShares sharesWith(size_t maxSharedDataBytes) {
   Limits limits;
-  limits.maxSharedDataBytesPerUser = 10000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  limits.maxSharedDataBytesPerUser = maxSharedDataBytes;
+  return UserShares::of(limits, uint64_t{1} << 30, 1024);
+}
+
+TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
+  UserBudget budget(sharesWith(10000));
   SharedDataStore store(budget);
   EXPECT_FALSE(store.dictionary("T"));
   store.removeObject("T", "k");
@@ -23,18 +27,14 @@ TEST(SharedDataStore, HoldsNothingForATokenThatNobodyUsed) {
 }
 
 TEST(SharedDataStore, AnEmptyUpdateMakesAnEmptyDictionary) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 10000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(10000));
   SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary(), kOne));
   EXPECT_EQ(store.dictionary("T"), Dictionary());
 }
 
 TEST(SharedDataStore, ChargesAValueToWhoWroteItLast) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 10000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(10000));
   SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
   const uint64_t before = store.bytesOfUser(kOne);
@@ -45,9 +45,7 @@ TEST(SharedDataStore, ChargesAValueToWhoWroteItLast) {
 }
 
 TEST(SharedDataStore, ChargesWhatContainersHold) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 100000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(100000));
   SharedDataStore store(budget);
   EXPECT_TRUE(store.update(
       "T", Dictionary{{"k", Array{std::string(100, 'x'), Dictionary{{"n", Data(std::string(200, 'd'))}}}}},
@@ -56,9 +54,7 @@ TEST(SharedDataStore, ChargesWhatContainersHold) {
 }
 
 TEST(SharedDataStore, AUserMayReplaceAValueAtTheLimit) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 1500;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(1500));
   SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", std::string(900, 'x')}}, kOne));
   EXPECT_FALSE(store.update("T", Dictionary{{"l", std::string(900, 'x')}}, kOne));
@@ -68,9 +64,7 @@ TEST(SharedDataStore, AUserMayReplaceAValueAtTheLimit) {
 }
 
 TEST(SharedDataStore, ARefusedUpdateMakesNoToken) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 300;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(300));
   SharedDataStore store(budget);
   EXPECT_FALSE(store.update("T", Dictionary{{"k", std::string(1000, 'x')}}, kOne));
   EXPECT_FALSE(store.dictionary("T"));
@@ -78,9 +72,7 @@ TEST(SharedDataStore, ARefusedUpdateMakesNoToken) {
 }
 
 TEST(SharedDataStore, ManyEmptyEntriesPassTheLimitToo) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 10000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(10000));
   SharedDataStore store(budget);
   int accepted = 0;
   while (accepted < 1000 && store.update("T", Dictionary{{std::to_string(accepted), 0}}, kOne)) ++accepted;
@@ -108,9 +100,7 @@ TEST(SharedDataStore, TakesOfItsUsersMemory) {
 }
 
 TEST(SharedDataStore, WhatIsRemovedIsChargedNoMore) {
-  Limits limits;
-  limits.maxSharedDataBytesPerUser = 10000;
-  UserBudget budget(UserShares::of(limits, uint64_t{1} << 30, 1024));
+  UserBudget budget(sharesWith(10000));
   SharedDataStore store(budget);
   EXPECT_TRUE(store.update("T", Dictionary{{"k", 1}, {"l", std::string(800, 'x')}}, kOne));
   store.removeObject("T", "l");

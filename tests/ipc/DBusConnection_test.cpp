@@ -103,15 +103,16 @@ class Connected : public ::testing::Test, public ListenerDelegate {
     pipe_->toServer.append(bytes);
     EXPECT_TRUE(reactor_.report(kStream, ready::readable));
   }
-  static std::string displayURLCalls(unsigned count) {
+  static std::string calls(std::string_view member, unsigned count) {
     std::string bytes;
     MessageWriter writer(bytes);
     for (unsigned i = 1; i <= count; ++i) {
-      writer.beginCall(i, {.member = "FetchDisplayURL"});
+      writer.beginCall(i, {.member = member});
       EXPECT_TRUE(writer.end());
     }
     return bytes;
   }
+  static std::string displayURLCalls(unsigned count) { return calls("FetchDisplayURL", count); }
 
   Limits limits_ = [] {
     Limits limits;
@@ -243,11 +244,7 @@ TEST_F(DBusConnectionTest, HandsItsWorkerBackAfterAMebibyte) {
 
 TEST_F(DBusConnectionTest, RepliesFromOutsideATurnLeaveAtOnce) {
   shakeHands();
-  std::string bytes;
-  MessageWriter writer(bytes);
-  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
-  ASSERT_TRUE(writer.end());
-  say(bytes);
+  say(calls("StartConfigWithCompletionHandler", 1));
   executor_.runAll();
   ASSERT_EQ(session_->held.size(), 1u);
   EXPECT_EQ(pipe_->writes, 0u);
@@ -259,11 +256,7 @@ TEST_F(DBusConnectionTest, RepliesFromOutsideATurnLeaveAtOnce) {
 
 TEST_F(DBusConnectionTest, AnswersThatComeAfterTheEndAreDropped) {
   shakeHands();
-  std::string bytes;
-  MessageWriter writer(bytes);
-  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
-  ASSERT_TRUE(writer.end());
-  say(bytes);
+  say(calls("StartConfigWithCompletionHandler", 1));
   pipe_->ended = true;
   executor_.runAll();
   EXPECT_TRUE(reactor_.report(kStream, ready::readable | ready::ended));
@@ -550,11 +543,7 @@ TEST_F(DBusConnectionTest, AClientThatEndedItsSideIsReadToTheEndAlthoughItTakesN
 TEST_F(DBusConnectionTest, NothingIsKeptForAClientThatPassedTwiceTheLimit) {
   shakeHands();
   pipe_->room = 0;
-  std::string call;
-  MessageWriter writer(call);
-  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
-  ASSERT_TRUE(writer.end());
-  say(call);
+  say(calls("StartConfigWithCompletionHandler", 1));
   executor_.runAll();
   ASSERT_EQ(session_->held.size(), 1u);
   session_->held[0](Array{std::string(50000, 'x')});
@@ -585,11 +574,7 @@ TEST_F(DBusConnectionTest, AMessageThatCannotBeWrittenIsAnErrorAndCounted) {
 TEST_F(DBusConnectionTest, TheMessageThatEndsAnAggregationEndsNoConnection) {
   shakeHands();
   pipe_->room = 0;
-  std::string call;
-  MessageWriter writer(call);
-  writer.beginCall(1, {.member = "StartConfigWithCompletionHandler"});
-  ASSERT_TRUE(writer.end());
-  say(call);
+  say(calls("StartConfigWithCompletionHandler", 1));
   executor_.runAll();
   ASSERT_EQ(session_->held.size(), 1u);
   session_->held[0](Array{std::string(39880, 'x')});  // nearly twice the limit
