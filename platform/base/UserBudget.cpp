@@ -61,7 +61,7 @@ std::shared_ptr<UserAccount> UserBudget::account(uint32_t user) {
   std::shared_ptr<UserAccount>& account = accounts_[user];
   if (account) return account;
   account = std::make_shared<UserAccount>(user, shares_);
-  const std::shared_ptr<UserAccount> made = account;
+  std::shared_ptr<UserAccount> made = account;
   if (accounts_.size() >= sweepAt_) {
     std::erase_if(accounts_, [](const auto& each) {
       return each.second.use_count() == 1 && each.second->holdsNothing();

@@ -152,12 +152,14 @@ class CompactWriter {
 
   // The same bits are the same text, number or block; others may be so too, and are written anew. Both dictionaries are
   // alive, so no block of the one can be another's by now.
+  // NOLINTBEGIN(bugprone-suspicious-memory-comparison): the bits are what is asked for.
   static bool sameKey(const Dictionary& a, size_t i, const Dictionary& b, size_t j) {
     return std::memcmp(&a.begin()[i].key, &b.begin()[j].key, sizeof(kyt::String)) == 0;
   }
   static bool sameEntry(const Dictionary& a, size_t i, const Dictionary& b, size_t j) {
     return std::memcmp(&a.begin()[i], &b.begin()[j], sizeof(DictionaryEntry)) == 0;
   }
+  // NOLINTEND(bugprone-suspicious-memory-comparison)
 
   JSONTextStream stream_;
 };

@@ -12,7 +12,7 @@
 namespace kyt {
 namespace {
 
-constexpr const char* kPath = "/run/systemd/journal/socket";
+constexpr char kPath[] = "/run/systemd/journal/socket";
 
 }  // namespace
 
@@ -31,7 +31,8 @@ std::shared_ptr<JournalSocket> JournalSocket::open() {
 bool JournalSocket::connectAgain() {
   sockaddr_un address = {};
   address.sun_family = AF_UNIX;
-  std::strcpy(address.sun_path, kPath);
+  static_assert(sizeof kPath <= sizeof address.sun_path);
+  std::memcpy(address.sun_path, kPath, sizeof kPath);
   return ::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
 }
 

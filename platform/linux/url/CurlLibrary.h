@@ -39,6 +39,7 @@ struct CurlLibrary {
   // Loads and initialises it, or says why that failed.
   [[nodiscard]] static std::variant<CurlLibrary, std::string> load(const char* name);
 
+// NOLINTNEXTLINE(bugprone-macro-parentheses): a name that is declared cannot stand in parentheses
 #define ROW(here, there) decltype(::there)* here = nullptr;
   KYT_CURL_FUNCTIONS(ROW)
 #undef ROW
