@@ -9,6 +9,7 @@
 #include "platform/Platform.h"
 #include "platform/RandomSource.h"
 #include "platform/base/Counters.h"
+#include "platform/base/Hex.h"
 #include "platform/base/UserBudget.h"
 #include "platform/queues/SerialQueue.h"
 

@@ -159,12 +159,4 @@ std::array<uint8_t, 3> versionParts(std::string_view version) {
   return parts;
 }
 
-void appendHex(std::span<const std::byte> bytes, std::string& out) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  for (const std::byte byte : bytes) {
-    out += kDigits[std::to_integer<unsigned>(byte) >> 4];
-    out += kDigits[std::to_integer<unsigned>(byte) & 0xF];
-  }
-}
-
 }  // namespace kyt

@@ -1,5 +1,5 @@
-// Small operations on text that back ends share: splitting, comparing without case, versions, hexadecimal
-// digits. Pure functions; any thread.
+// Small operations on text that back ends share: splitting, comparing without case, versions. Pure functions; any
+// thread.
 //
 // Case: Unicode's simple case folding, of each character by itself, in no language's own way (a dotless i is no i). What
 // is no UTF-8 equals itself alone. A character and what it folds to may take different numbers of bytes: the Kelvin sign
@@ -9,7 +9,6 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
-#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -37,8 +36,5 @@ struct UnfoldedSizes {
 // "major.middle.minor": the integer values of the first three pieces, each cut to its low eight bits; a
 // missing piece and one that is no number are 0.
 [[nodiscard]] std::array<uint8_t, 3> versionParts(std::string_view version);
-
-// Two lower-case digits for each byte.
-void appendHex(std::span<const std::byte> bytes, std::string& out);
 
 }  // namespace kyt

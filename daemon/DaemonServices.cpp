@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "backends/BackendTable.h"
+#include "platform/base/Hex.h"
 #include "platform/base/Semaphore.h"
 
 namespace kyt {
@@ -22,13 +23,8 @@ std::string wireMachineId(DeviceIdentity& identity, Cryptography& cryptography) 
   identity.deviceUniqueIDCString(deviceID, kDeviceIDSize);
   const std::string text = std::string("com.vantu.kytreportingd ") + deviceID;
   const auto digest = cryptography.sha256(std::as_bytes(std::span(text)));
-  constexpr char digits[] = "0123456789abcdef";
   std::string id;
-  for (size_t i = 0; i < 16; ++i) {
-    const auto byte = std::to_integer<unsigned>(digest[i]);
-    id += digits[byte >> 4];
-    id += digits[byte & 15];
-  }
+  appendHex(std::span(digest).first(16), id);
   return id;
 }
 

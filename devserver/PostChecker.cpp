@@ -12,6 +12,7 @@
 
 #include "devserver/Gzip.h"
 #include "devserver/Text.h"
+#include "platform/base/Hex.h"
 
 namespace kyt::devserver {
 namespace {
@@ -162,12 +163,10 @@ std::string digestText(std::string_view key, std::string_view body) {
   unsigned size = 0;
   HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()),
        reinterpret_cast<const unsigned char*>(body.data()), body.size(), digest, &size);
-  constexpr char kHex[] = "0123456789abcdef";
   std::string text = "<";
   for (unsigned i = 0; i < size; ++i) {
     if (i > 0 && i % 4 == 0) text += ' ';
-    text += kHex[digest[i] >> 4];
-    text += kHex[digest[i] & 15];
+    appendHexByte(digest[i], text);
   }
   return text + ">";
 }

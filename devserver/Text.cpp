@@ -5,18 +5,15 @@
 #include <chrono>
 #include <cmath>
 
+#include "platform/base/Hex.h"
 #include "platform/base/TextEscape.h"
 
 namespace kyt::devserver {
 namespace {
 
-constexpr char kHex[] = "0123456789abcdef";
-
 void appendEscape(std::string& out, char c) {
-  const auto byte = static_cast<unsigned char>(c);
   out += "\\x";
-  out += kHex[byte >> 4];
-  out += kHex[byte & 15];
+  appendHexByte(static_cast<uint8_t>(c), out);
 }
 
 }  // namespace
@@ -76,10 +73,9 @@ std::optional<std::string> bytesFromHex(std::string_view text) {
   if (text.size() % 2 != 0) return std::nullopt;
   std::string bytes;
   for (size_t i = 0; i < text.size(); i += 2) {
-    unsigned value = 0;
-    const auto [end, error] = std::from_chars(text.data() + i, text.data() + i + 2, value, 16);
-    if (error != std::errc() || end != text.data() + i + 2) return std::nullopt;
-    bytes += static_cast<char>(value);
+    const int high = hexDigit(text[i]), low = hexDigit(text[i + 1]);
+    if (high < 0 || low < 0) return std::nullopt;
+    bytes += static_cast<char>(high * 16 + low);
   }
   return bytes;
 }

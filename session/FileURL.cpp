@@ -3,18 +3,13 @@
 #include <string>
 #include <string_view>
 
+#include "platform/base/Hex.h"
+
 namespace kyt {
 
 namespace {
 
 constexpr size_t kLongestPath = 4095;  // of any file here; a longer one would only fill logs and requests
-
-int hexDigit(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
 
 }  // namespace
 

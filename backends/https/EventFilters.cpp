@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "backend/Text.h"
+#include "platform/base/Hex.h"
 
 namespace kyt {
 

@@ -14,6 +14,7 @@
 #include "platform/Platform.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
+#include "platform/base/Hex.h"
 #include "platform/base/JSONLayout.h"
 #include "platform/base/UserBudget.h"
 #include "platform/objects/Description.h"

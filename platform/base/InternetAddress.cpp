@@ -2,6 +2,8 @@
 
 #include <optional>
 
+#include "platform/base/Hex.h"
+
 namespace kyt {
 
 namespace {
@@ -13,11 +15,8 @@ bool isBlank(char c) {
   return c == ' ' || (c >= '\t' && c <= '\r');
 }
 
-int digitValue(char c) {
-  if (isDigit(c)) return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return 16;
+unsigned digitValue(char c) {
+  return static_cast<unsigned>(hexDigit(c));  // far above every base where it is none
 }
 
 // One number from the front of the text, in the base that its beginning says.
@@ -32,8 +31,8 @@ std::optional<uint32_t> takeNumber(std::string_view& text) {
     base = 8;
   }
   uint64_t number = 0;
-  while (!text.empty() && static_cast<unsigned>(digitValue(text[0])) < base) {
-    number = number * base + static_cast<unsigned>(digitValue(text[0]));
+  while (!text.empty() && digitValue(text[0]) < base) {
+    number = number * base + digitValue(text[0]);
     if (number > UINT32_MAX) return std::nullopt;
     text.remove_prefix(1);
   }

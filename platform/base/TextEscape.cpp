@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cstdint>
 
+#include "platform/base/Hex.h"
+
 namespace kyt {
 namespace {
 
@@ -31,7 +33,6 @@ bool mayBeShown(std::string_view sequence) {
 }
 
 void appendEscapedByte(std::string& out, uint8_t byte) {
-  static constexpr char kDigits[] = "0123456789abcdef";
   switch (byte) {
     case '\t':
       out += "\\t";
@@ -46,8 +47,7 @@ void appendEscapedByte(std::string& out, uint8_t byte) {
       break;
   }
   out += "\\x";
-  out += kDigits[byte >> 4];
-  out += kDigits[byte & 15];
+  appendHexByte(byte, out);
 }
 
 }  // namespace

@@ -3,6 +3,8 @@
 #include <charconv>
 #include <utility>
 
+#include "platform/base/Hex.h"
+
 namespace kyt {
 namespace {
 
@@ -31,13 +33,6 @@ std::string_view takeWord(std::string_view& text) {
   text = end == std::string_view::npos ? std::string_view() : text.substr(end + 1);
   while (!text.empty() && text.front() == ' ') text.remove_prefix(1);
   return word;
-}
-
-int hexDigit(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
 }
 
 // The user whose number, in ASCII digits, was sent in hexadecimal.
@@ -145,13 +140,9 @@ ServerHandshake::Status ServerHandshake::feed(std::span<const std::byte> bytes, 
 }
 
 std::string ClientHandshake::opening(uint32_t user) {
-  static constexpr char kHex[] = "0123456789abcdef";
   std::string text(1, '\0');
   text.append("AUTH EXTERNAL ");
-  for (char digit : std::to_string(user)) {
-    text.push_back(kHex[static_cast<unsigned char>(digit) >> 4]);
-    text.push_back(kHex[static_cast<unsigned char>(digit) & 15]);
-  }
+  appendHex(std::to_string(user), text);
   text.append("\r\nNEGOTIATE_UNIX_FD\r\nBEGIN\r\n");
   return text;
 }

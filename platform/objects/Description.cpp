@@ -6,6 +6,7 @@
 #include <cmath>
 #include <cstdio>
 
+#include "platform/base/Hex.h"
 #include "platform/objects/Description.h"
 #include "platform/objects/Value.h"
 
@@ -53,16 +54,6 @@ void appendDate(std::string& out, Date date) {
                                    static_cast<long long>(civil.year), civil.month, civil.day, ofDay / 3600,
                                    ofDay / 60 % 60, ofDay % 60);
   out.append(text, static_cast<size_t>(length));
-}
-
-void appendHex(std::string& out, std::string_view bytes) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  out += '<';
-  for (const char c : bytes) {
-    out += kDigits[static_cast<unsigned char>(c) >> 4];
-    out += kDigits[static_cast<unsigned char>(c) & 15];
-  }
-  out += '>';
 }
 
 void appendQuoted(std::string& out, std::string_view text) {
@@ -137,7 +128,9 @@ void appendScalar(std::string& out, const Value& value) {
       appendDate(out, *value.date());
       break;
     case Value::Kind::data:
-      appendHex(out, value.data()->view());
+      out += '<';
+      appendHex(value.data()->bytes(), out);
+      out += '>';
       break;
     case Value::Kind::string:
       out += value.string()->view();

@@ -6,6 +6,7 @@
 
 #include "backend/Text.h"
 #include "platform/base/Counters.h"
+#include "platform/base/Hex.h"
 #include "platform/queues/SerialQueue.h"
 #include "tests/support/TestPlatform.h"
 

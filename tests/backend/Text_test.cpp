@@ -109,11 +109,5 @@ TEST(Text, ReadsThreePartsOfAVersionModulo256) {
   EXPECT_EQ(versionParts(""), (Parts{0, 0, 0}));
 }
 
-TEST(Text, WritesLowerCaseHexadecimalDigits) {
-  std::string text;
-  appendHex(std::as_bytes(std::span(std::string_view("\x0A\xFF"))), text);
-  EXPECT_EQ(text, "0aff");
-}
-
 }  // namespace
 }  // namespace kyt

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <utility>
 
+#include "platform/base/Hex.h"
 #include "platform/base/TextEscape.h"
 #include "platform/linux/files/Files.h"
 
@@ -113,20 +114,9 @@ std::optional<std::string> kernelRelease() {
   return usable(names.release);
 }
 
-int hexDigit(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  return -1;
-}
-
-template <typename Container>
-std::string hexText(const Container& bytes) {
-  static constexpr char kDigits[] = "0123456789abcdef";
+std::string hexText(Bytes bytes) {
   std::string text;
-  for (const auto byte : bytes) {
-    text += kDigits[static_cast<unsigned>(byte) >> 4];
-    text += kDigits[static_cast<unsigned>(byte) & 15];
-  }
+  appendHex(bytes, text);
   return text;
 }
 
