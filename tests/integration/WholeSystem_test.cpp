@@ -1,7 +1,10 @@
 // The main job with everything real: client processes, the daemon, the development server.
 #include <gtest/gtest.h>
 
+#include <cstdlib>
+
 #include "tests/integration/StageFixture.h"
+#include "tools/demo/Http.h"
 
 namespace kyt {
 namespace {
@@ -20,6 +23,36 @@ TEST_F(WholeSystem, ShowsItselfInTheDemonstration) {
   EXPECT_NE(demonstration.text.find("ok     the daemon runs as its own user, without capabilities"),
             std::string::npos)
       << "root's demonstration gives the daemon and its clients users of their own";
+}
+
+// The page's figures, asked for as a browser does.
+long eventsAt(const std::string& page) {
+  const auto answer = tools::httpGet(page + "api/totals");
+  const size_t at = answer ? answer->body.find("\"events\":") : std::string::npos;
+  return at != std::string::npos ? std::strtol(answer->body.c_str() + at + 9, nullptr, 10) : -1;
+}
+
+TEST_F(WholeSystem, GoesOnReportingUntilTheDemonstrationIsInterrupted) {
+  const TemporaryFolder folder;
+  tools::ChildProcess::Options how;
+  how.outputFile = folder / "output";
+  auto demonstration = tools::ChildProcess::start(std::string(KYT_PROGRAMS) + "/kytdemo",
+                                                  {"--programs", KYT_PROGRAMS, "--share", KYT_SHARE}, how);
+  ASSERT_TRUE(demonstration);
+  const auto said = [&] { return contents(how.outputFile); };
+  ASSERT_TRUE(tools::waitUntil(std::chrono::seconds(120), [&] {
+    return said().find(" owner show\n") != std::string::npos || !demonstration->isRunning();
+  }));
+  const std::string text = said();
+  const size_t at = text.find("See them come in at ");
+  ASSERT_NE(at, std::string::npos) << text;
+  const std::string page = text.substr(at + 20, text.find(' ', at + 20) - at - 20);
+  // Each session's start message comes with its first flush, so what is more are events of the trickle.
+  EXPECT_TRUE(tools::waitUntil(std::chrono::seconds(120), [&] { return eventsAt(page) >= 30; })) << said();
+  demonstration->signal(SIGINT);
+  EXPECT_EQ(demonstration->wait(std::chrono::seconds(60)), 0) << said();
+  EXPECT_NE(said().find("ok     the daemon ended with status 0 after SIGTERM"), std::string::npos) << said();
+  EXPECT_EQ(said().find("WRONG"), std::string::npos) << said();
 }
 
 TEST_F(WholeSystem, CarriesTheEventsOfTheExamples) {

@@ -28,14 +28,8 @@ Dictionary guest(const std::string& base) {
           {"post_url", base + "/events/example"}};
 }
 
-std::string script(const std::string& name, int sessionID, int clientType) {
-  const std::string user = "{\"ClientName\":\"" + name + "\",\"ServiceName\":\"demo\"}";
-  std::string text =
-      "{\"do\":\"open\",\"sessionInfo\":{\"SessionID\":" + std::to_string(sessionID) +
-      ",\"ClientType\":" + std::to_string(clientType) +
-      ",\"ClientVersion\":3,\"BatchEvent\":true,\"RequireUserInfo\":true},\"userInfo\":" + user + "}\n";
-  text += "{\"do\":\"configure\"}\n";
-  text += std::string("{\"do\":\"digestKey\",\"hex\":\"") + kDemoDigestKeyHex + "\",\"algorithm\":0}\n";
+std::string script(const DemoClient& client, int sessionID) {
+  std::string text = openingSteps(client, sessionID);
   text += "{\"do\":\"displayURL\"}\n";
   text +=
       std::string(
@@ -59,12 +53,27 @@ Dictionary demoBag(const std::string& serverBase, const std::string& backend, co
   return {{"version", "demo-1"}, {"refresh_cycle", 3600}, {"release", section}, {"vantu_internal", section}};
 }
 
+std::vector<DemoClient> demoClients() {
+  return {{"kytdemo", 20}, {"kytdemo-plain", 8}};
+}
+
+std::string openingSteps(const DemoClient& client, int sessionID) {
+  std::string text =
+      "{\"do\":\"open\",\"sessionInfo\":{\"SessionID\":" + std::to_string(sessionID) +
+      ",\"ClientType\":" + std::to_string(client.clientType) +
+      ",\"ClientVersion\":3,\"BatchEvent\":true,\"RequireUserInfo\":true},\"userInfo\":{\"ClientName\":\"" +
+      client.name + "\",\"ServiceName\":\"demo\"}}\n";
+  text += "{\"do\":\"configure\"}\n";
+  text += std::string("{\"do\":\"digestKey\",\"hex\":\"") + kDemoDigestKeyHex + "\",\"algorithm\":0}\n";
+  return text;
+}
+
 std::string signedClientScript() {
-  return script("kytdemo", 7001, 20);
+  return script(demoClients()[0], 7001);
 }
 
 std::string plainClientScript() {
-  return script("kytdemo-plain", 7002, 8);
+  return script(demoClients()[1], 7002);
 }
 
 }  // namespace kyt::tools

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "platform/objects/Value.h"
 
@@ -19,7 +20,15 @@ inline constexpr char kDemoAccount[] = "owner@example.org";
 [[nodiscard]] Dictionary demoBag(const std::string& serverBase, const std::string& backend,
                                  const std::string& clientName);
 
-// Sessions in kytctl's script form.
+// Those that the bags are for.
+struct DemoClient {
+  std::string name;
+  int clientType = 0;
+};
+[[nodiscard]] std::vector<DemoClient> demoClients();
+
+// Sessions in kytctl's script form: the steps with which one begins that goes on, and whole ones.
+[[nodiscard]] std::string openingSteps(const DemoClient& client, int sessionID);
 [[nodiscard]] std::string signedClientScript();
 [[nodiscard]] std::string plainClientScript();
 

@@ -1,6 +1,7 @@
 // kytdemo: the main job from end to end on one machine, behind `./kyt run`. Starts the development server and
 // the daemon under a private root, lets real client processes report real events, checks each of them at the
-// server, prints what arrived where, and stays up with the page open until Ctrl-C (or ends: --once).
+// server, prints what arrived where, and stays up with the page open, and the clients reporting now and then, until Ctrl-C
+// (or ends: --once).
 #include <signal.h>
 #include <unistd.h>
 
@@ -14,6 +15,7 @@
 #include "tools/demo/Checks.h"
 #include "tools/demo/DemoBag.h"
 #include "tools/demo/Stage.h"
+#include "tools/demo/Trickle.h"
 
 namespace {
 
@@ -68,13 +70,42 @@ Check checkConfined(Stage& stage) {
           closed == "1" && filter == "2", "NoNewPrivs " + closed + "; Seccomp " + filter};
 }
 
-void waitForInterrupt() {
+// Whether Ctrl-C, or whoever else ends this, came within that time.
+bool interruptedWithin(std::chrono::milliseconds time) {
   sigset_t set;
   sigemptyset(&set);
   sigaddset(&set, SIGINT);
   sigaddset(&set, SIGTERM);
-  int number = 0;
-  sigwait(&set, &number);
+  const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(time);
+  const timespec most{seconds.count(), std::chrono::nanoseconds(time - seconds).count()};
+  return sigtimedwait(&set, nullptr, &most) > 0;
+}
+
+void printCommands(Stage& stage) {
+  const std::string kytctl = stage.program("kytctl") + " --root " + stage.folder();
+  std::printf(
+      "\nTwo clients go on reporting until Ctrl-C, which ends all of it. See them come in at %s/ , and try:\n\n",
+      stage.httpBase().c_str());
+  std::printf("  %s owner show\n", kytctl.c_str());
+  std::printf("  %s consent withdraw     # counts for sessions that begin from then on\n", kytctl.c_str());
+  std::printf(
+      "  %s explain '{\"Category\":10,\"Type\":1,\"Payload\":{\"secret\":1}}' --client-type 8 --client kytdemo-plain "
+      "--service demo --require-user-info\n",
+      kytctl.c_str());
+  std::printf(
+      "  %s send --client-type 20 --category 1 --type 2 --payload '{\"a\":1}' --user-info "
+      "'{\"ClientName\":\"example\",\"ServiceName\":\"demo\"}' --require-user-info\n\n",
+      kytctl.c_str());
+  std::fflush(stdout);
+}
+
+std::optional<std::string> goOnUntilInterrupted(Stage& stage) {
+  Trickle trickle;
+  if (auto problem = trickle.start(stage)) return problem;
+  printCommands(stage);
+  while (!interruptedWithin(trickle.pause())) trickle.step();
+  trickle.finish();
+  return std::nullopt;
 }
 
 int demonstrate(Stage& stage, bool once) {
@@ -105,9 +136,7 @@ int demonstrate(Stage& stage, bool once) {
   }
   printArrivals(stage);
   if (!once) {
-    std::printf("\nThe page is at %s/ ; Ctrl-C ends the daemon and the server.\n", stage.httpBase().c_str());
-    std::fflush(stdout);
-    waitForInterrupt();
+    if (const auto problem = goOnUntilInterrupted(stage)) return complain(*problem);
   }
   const std::optional<int> status = stage.stopDaemon();
   if (status != 0) ++wrong;
