@@ -39,6 +39,7 @@ KYTReportingBackend::KYTReportingBackend(Making, Platform& platform, String name
       facts_(std::move(facts)),
       samplingFactor_(platform.random.uniform(101) / 100.0),
       stateQueue_(SerialQueue::create("com.vantu.KYTReportingBackendStateQueue", platform.executor)),
+      standing_(std::make_shared<BackEndStanding>(name_.str())),
       batchEvents_(facts_->batchEvents) {}
 
 KYTReportingBackend::~KYTReportingBackend() {
@@ -107,10 +108,13 @@ int32_t KYTReportingBackend::state() const {
   });
 }
 
-void KYTReportingBackend::setState(int32_t state) {
-  stateQueue_->async([this, state] {
+void KYTReportingBackend::setState(int32_t state, StateRule rule, int status) {
+  const auto now = static_cast<uint32_t>(platform_.clock.timeOfDay().asSeconds());
+  const BackEndStanding::State shown{static_cast<uint8_t>(state), rule, static_cast<uint16_t>(status), now};
+  stateQueue_->async([this, state, shown] {
     stateQueue_->assertCurrent();
     state_ = state;
+    standing_->setState(shown);
   });
 }
 

@@ -20,6 +20,7 @@
 #include <string_view>
 #include <utility>
 
+#include "backend/BackEndStanding.h"
 #include "backend/ReportingSessionConnectivityInterface.h"
 #include "backend/SessionFacts.h"
 #include "backend/SessionIDPath.h"
@@ -108,8 +109,11 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
   // before it.
   [[nodiscard]] int32_t state() const;
-  void setState(int32_t state);
+  // `rule`: what decided it, and the status of the server's answer, if that did.
+  void setState(int32_t state, StateRule rule = StateRule::none, int status = 0);
   virtual void updateState();
+  // Any thread; it outlives the back end for whoever has it.
+  [[nodiscard]] const std::shared_ptr<BackEndStanding>& standing() const { return standing_; }
 
   // The operation that every event goes through. The returned text goes into the local message log and into the reply; it
   // may be missing where the answer reader wants none. The message comes by
@@ -199,6 +203,7 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   const SharedSessionFacts facts_;
   const double samplingFactor_;
   const std::shared_ptr<SerialQueue> stateQueue_;
+  const std::shared_ptr<BackEndStanding> standing_;
 
   // The session's queue.
   uint16_t eventID_ = 0;

@@ -19,6 +19,7 @@
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/fake/MemoryStream.h"
 #include "platform/ipc/BodyReader.h"
+#include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageReader.h"

@@ -111,6 +111,7 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
   fetch.lastModified = lastModified;
   URLRequest request = storebagRequest(name, lastModified);
   const std::string address = request.url;
+  fetch.address = address;
   const URLReply reply = startAndWait(std::move(request), [this](URLRequest sent, URLCompletion completion) {
     urlSession().start(std::move(sent), std::move(completion));
   });
@@ -118,6 +119,7 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
     log.normal(
         "fetchStorebagWithName: Error resolving with lookup server %s, sendSynchronousRequest error %s",
         address.c_str(), reply.error ? reply.error->localizedDescription.c_str() : "(null)");
+    fetch.problem = reply.error ? reply.error->localizedDescription : "no answer";
     if (!name || *name != kFallbackStorebagName) return fetch;
     log.normal("fetchStorebagWithName: Loading default storebag '%s'", name->c_str());
     log.normal(
@@ -139,10 +141,12 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
   }
   // The status decides nothing, but an error page is no storebag, and then it is the reason that helps.
   const int status = reply.response->status;
-  if (std::optional<Dictionary> bag = verifiedBag(reply))
+  if (std::optional<Dictionary> bag = verifiedBag(reply, fetch.problem)) {
     fetch.result = std::move(*bag);
-  else if (status < 200 || status > 299)
+  } else if (status < 200 || status > 299) {
     log.normal("fetchStorebagWithName: %s answered with status %d", address.c_str(), status);
+    fetch.problem = "status " + std::to_string(status);
+  }
   return fetch;
 }
 
@@ -177,7 +181,7 @@ bool StorebagFetcher::verifies(const Data& bag, const Data& signature) const {
   return false;
 }
 
-std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply) {
+std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply, std::string& problem) {
   Log& log = configuration_.platform.log;
   PropertyLists& propertyLists = configuration_.platform.propertyLists;
   std::variant<Value, Error> document =
@@ -188,13 +192,19 @@ std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply) {
   const Dictionary* dictionary = root != nullptr ? root->dictionary() : nullptr;
   if (dictionary == nullptr || dictionary->string("signature") == nullptr) {
     log.error("fetchStorebagWithName: Signature is missing");
+    problem = "the reply is no signed storebag";
     return std::nullopt;
   }
 
   const std::optional<Data> signature = decodedEntry(*dictionary, "signature", log);
   const std::optional<Data> bag = decodedEntry(*dictionary, "bag", log);
-  if (!signature || !bag || !verifies(*bag, *signature)) return std::nullopt;
-  return signedContents(*bag, propertyLists, log);
+  if (!signature || !bag || !verifies(*bag, *signature)) {
+    problem = "the signature cannot be verified";
+    return std::nullopt;
+  }
+  std::optional<Dictionary> contents = signedContents(*bag, propertyLists, log);
+  if (!contents) problem = "what the signature covers is no dictionary";
+  return contents;
 }
 
 StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagForEnvironmentAndClientType(
@@ -210,6 +220,8 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
   Fetch<Dictionary> whole = fetchStorebagWithName(storebagNameForClientType(clientType), lastModified);
   fetch.maxAge = whole.maxAge;
   fetch.lastModified = std::move(whole.lastModified);
+  fetch.address = std::move(whole.address);
+  fetch.problem = std::move(whole.problem);
   if (std::holds_alternative<NotModified>(whole.result)) {
     fetch.result = NotModified();
     return fetch;
@@ -221,7 +233,10 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
     return fetch;
   }
   const Dictionary* section = sectionInForce(*bag, clientType);
-  if (section == nullptr) return fetch;
+  if (section == nullptr) {
+    fetch.problem = "the storebag has no section for the environment in force";
+    return fetch;
+  }
 
   // A bag that does not say its version cannot be told from another one, so it counts as a failed fetch.
   const String* version = bag->string("version");
@@ -229,6 +244,7 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
     log.normal(
         "fetchStorebagForEnvironmentAndClientType: The storebag for client type %d has no text \"version\"",
         clientType);
+    fetch.problem = "the storebag has no text \"version\"";
     return fetch;
   }
   if (const Value* refreshCycle = bag->find("refresh_cycle")) {

@@ -15,6 +15,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <string>
 #include <variant>
 #include <vector>
 
@@ -46,6 +47,8 @@ class StorebagFetcher {
     std::variant<Fetched, NotModified, Failed> result = Failed();
     int32_t maxAge = 0;                  // seconds; 0 when no reply came
     std::optional<String> lastModified;  // to ask with next time: the reply's, else the one asked with
+    std::string address;                 // where it was asked for; empty: nowhere
+    std::string problem;                 // why there is no good bag of the server's; empty: there is
   };
 
   StorebagFetcher(Configuration configuration, Mutex& backendClassLock);
@@ -65,7 +68,8 @@ class StorebagFetcher {
   [[nodiscard]] URLRequest storebagRequest(const std::optional<String>& name,
                                            const std::optional<String>& lastModified) const;
   URLSession& urlSession();
-  std::optional<Dictionary> verifiedBag(const URLReply& reply);
+  // None with the reason in `problem`.
+  std::optional<Dictionary> verifiedBag(const URLReply& reply, std::string& problem);
   [[nodiscard]] const Dictionary* sectionInForce(const Dictionary& bag, int32_t clientType) const;
   [[nodiscard]] std::vector<std::unique_ptr<PublicKey>> publicKeys() const;
   [[nodiscard]] bool verifies(const Data& bag, const Data& signature) const;

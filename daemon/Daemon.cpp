@@ -19,6 +19,7 @@
 #include "platform/linux/confinement/LinuxConfinement.h"
 #include "platform/linux/data/MakeDeflate.h"
 #include "platform/linux/device/DepartureFile.h"
+#include "platform/linux/entitlements/AccountNumbers.h"
 #include "platform/linux/files/Files.h"
 #include "platform/linux/helpers/DeletionBroker.h"
 #include "platform/linux/helpers/ProgramInspector.h"
@@ -129,6 +130,29 @@ int waitForTheEnd(StopSignals& signals, DaemonReload& reload) {
   }
 }
 
+// Who may look at the daemon: members of the group, which the system may not know.
+AdministrationAccess administrationAccess(const Settings& settings, Log& log) {
+  AdministrationAccess access{.user = currentUser(), .group = std::nullopt, .groupName = settings.adminGroup};
+  if (settings.adminGroup.empty()) return access;
+  access.group = AccountNumbers().group(settings.adminGroup);
+  if (!access.group)
+    log.error(
+        "main: There is no group \"%s\" (admin.group): root and the daemon's user alone may look at the daemon",
+        settings.adminGroup.c_str());
+  return access;
+}
+
+// Made while the process may still take the group. Without it the daemon serves all the same.
+std::unique_ptr<UnixSocketAcceptor> administrationSocket(const Paths& paths,
+                                                         const AdministrationAccess& access, Log& log) {
+  auto made = UnixSocketAcceptor::bindForGroup(paths.administration(), access.group);
+  if (const Error* error = std::get_if<Error>(&made)) {
+    log.error("main: Nobody can look at the daemon: %s", error->localizedDescription.c_str());
+    return nullptr;
+  }
+  return std::move(std::get<std::unique_ptr<UnixSocketAcceptor>>(made));
+}
+
 struct Configured {
   Settings& settings;
   const Paths& paths;
@@ -138,7 +162,7 @@ struct Configured {
 
 int serve(const Configured& configured, Log& log, Counters& counters, ProgramInspector& inspector,
           const DeletionBroker* broker, std::unique_ptr<Deflate> deflate, uint64_t memory,
-          Confinement& confinement, StopSignals& stopSignals) {
+          Confinement& confinement, StopSignals& stopSignals, DaemonServices::WindowStart window) {
   Settings& settings = configured.settings;
   const Paths& paths = configured.paths;
   auto socket = listeningSocket(paths);
@@ -177,6 +201,7 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
                                       .descriptors = LinuxConfinement::descriptorLimit()},
                            .messageLogs = paths.messageLogs(),
                            .acceptor = std::move(acceptor),
+                           .window = std::move(window),
                            .socketActivated = activated,
                            .idle = [&stopSignals] { stopSignals.request(); }});
   DaemonReload reload({configured.settingsFile, settings, log, configured.logLevel,
@@ -243,6 +268,10 @@ int runDaemon(const DaemonOptions& options) {
   const std::unique_ptr<DeletionBroker> broker = deletionBroker(confinement, log);
   const std::unique_ptr<ProgramInspector> inspector = programInspector(log);
   const uint64_t memory = memoryForTheDaemon();
+  DaemonServices::WindowStart window;
+  window.version = options.version;
+  window.access = administrationAccess(settings, log);
+  window.acceptor = administrationSocket(paths, window.access, log);
   if (const auto error = confine(confinement)) {
     log.error("main: confine_init() fails: %s\n", error->c_str());
     return kNotConfined;
@@ -251,7 +280,7 @@ int runDaemon(const DaemonOptions& options) {
   log.debug("main: At most %llu descriptors",
             static_cast<unsigned long long>(LinuxConfinement::descriptorLimit()));
   return serve({settings, paths, config, options.logLevel}, log, counters, *inspector, broker.get(),
-               std::move(deflate), memory, confinement, stopSignals);
+               std::move(deflate), memory, confinement, stopSignals, std::move(window));
 }
 
 }  // namespace kyt

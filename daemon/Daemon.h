@@ -17,6 +17,7 @@ struct DaemonOptions {
   std::string root;                  // stands in front of every fixed path; empty: none
   std::string config;                // the settings' file; empty: the fixed one
   std::optional<LogLevel> logLevel;  // instead of the settings'
+  std::string version;               // of the program, for administrators
 };
 
 // The process's exit status: 0 after an orderly end; 1 when it could not start, or ended in order since the system

@@ -21,8 +21,9 @@ WorkerPoolOptions workerPoolOptions(Counters& counters, Log& log, const UserBudg
   return options;
 }
 
-CurlURLSessionOptions urlSessionOptions(const Settings& settings) {
+CurlURLSessionOptions urlSessionOptions(const Settings& settings, ServerRecords& servers) {
   CurlURLSessionOptions options;
+  options.servers = &servers;
   options.certificateFile = settings.caFile;
   options.cellularInterfaces = settings.cellularInterfaces;
   options.whenQuiet = giveFreeMemoryBack;  // replies may end long after the last worker did
@@ -55,6 +56,7 @@ DaemonPlatform::DaemonPlatform(Start start)
     : memoryForUsers(start.memory),
       descriptorsForUsers(start.descriptors),
       budget(UserShares::of(start.settings.limits, start.memory, start.descriptors)),
+      books(clock),
       reactor(std::move(start.reactor)),
       workers(workerPoolOptions(start.counters, start.log, budget)),
       deflate(std::move(start.deflate)),
@@ -64,7 +66,7 @@ DaemonPlatform::DaemonPlatform(Start start)
       clientBundle(start.paths.clientBundle(), start.log),
       daemonBundle(start.paths.daemonBundle(), start.log),
       entitlements(entitlementsOptions(start.paths), start.inspector, start.log, start.counters, clock),
-      urlSessions(urlSessionOptions(start.settings), start.log, start.counters),
+      urlSessions(urlSessionOptions(start.settings, servers), start.log, start.counters),
       fileExtensions(start.broker, start.log, start.counters, budget),
       pluginBundles(start.paths.root, start.log),
       powerLog(start.counters),

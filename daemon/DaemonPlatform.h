@@ -14,6 +14,7 @@
 #include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Paths.h"
+#include "platform/base/ServerRecords.h"
 #include "platform/base/Settings.h"
 #include "platform/base/UserBudget.h"
 #include "platform/linux/base/EpollReactor.h"
@@ -62,8 +63,9 @@ struct DaemonPlatform {
 
   const uint64_t memoryForUsers, descriptorsForUsers;
   UserBudget budget;
-  Books books;
   LinuxClock clock;
+  Books books;
+  ServerRecords servers;
   const std::unique_ptr<EpollReactor> reactor;
   WorkerPool workers;
   LinuxRandom random;

@@ -7,6 +7,8 @@
 #include "backends/BackendTable.h"
 #include "platform/base/Hex.h"
 #include "platform/base/Semaphore.h"
+#include "platform/ipc/AdministrationDispatcher.h"
+#include "platform/linux/service/Process.h"
 
 namespace kyt {
 
@@ -73,17 +75,52 @@ DaemonServices::DaemonServices(Start start)
       transaction_({start.socketActivated, settings_.limits.idleExitSeconds}, *system_.reactor, queue_,
                    [this] { return endWhenIdle(); }),
       agent_(configuration_, fetcher_, sessionClass_, transaction_),
-      listener_(DBusServerServices{settings_.limits, counters_, log_, system_.clock, *system_.reactor,
-                                   system_.workers, *system_.reactor, system_.entitlements, system_.budget,
-                                   wireMachineId(deviceIdentity_, system_.cryptography)},
-                std::move(start.acceptor)) {
+      listener_(serverServices(), std::move(start.acceptor)),
+      administration_(administrationSources(std::move(start.window.version), start.system.inspector),
+                      std::move(start.window.access)) {
   listener_.setDelegate(agent_);
+  if (start.window.acceptor == nullptr) return;
+  DBusServerServices services = serverServices();
+  services.dispatcher = std::make_shared<AdministrationDispatcher>(counters_, services.machineId);
+  windows_.emplace(std::move(services), std::move(start.window.acceptor));
+  windows_->setDelegate(administration_);
+}
+
+DBusServerServices DaemonServices::serverServices() {
+  return {settings_.limits,
+          counters_,
+          log_,
+          system_.clock,
+          *system_.reactor,
+          system_.workers,
+          *system_.reactor,
+          system_.entitlements,
+          system_.budget,
+          wireMachineId(deviceIdentity_, system_.cryptography)};
+}
+
+AdministrationSources DaemonServices::administrationSources(std::string version,
+                                                            ProgramInspector& inspector) {
+  return {.platform = system_.ports,
+          .sessions = sessionClass_.standings(),
+          .storebags = agent_.storebags(),
+          .servers = system_.servers,
+          .version = std::move(version),
+          .since = system_.clock.timeOfDay().seconds,
+          .connections = [this] { return listener_.connectionCount(); },
+          .process =
+              [] {
+                const OwnFigures own = ownFigures();
+                return ProcessFigures{own.pid, own.residentBytes, own.anonymousBytes, own.threads};
+              },
+          .programOf = [&inspector](int32_t process) { return inspector.programPath(process); }};
 }
 
 DaemonServices::~DaemonServices() = default;
 
 void DaemonServices::resume() {
   listener_.resume();
+  if (windows_) windows_->resume();
   resumed_ = true;
   if (const auto interval = Watchdog::requestedInterval())
     watchdog_.emplace(*interval, *system_.reactor, system_.workers, &ServiceManager::alive);
@@ -118,6 +155,7 @@ bool DaemonServices::shutDown() {
   // Where the system refuses threads the deadline holds all the same.
   system_.workers.stopInsisting();
   listener_.stopAccepting();
+  if (windows_) windows_->stopAccepting();
   // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
   // monitor, which a download holds, and so that no session's end waits behind its own upload.
   system_.urlSessions.cancelAwaited();
@@ -125,6 +163,7 @@ bool DaemonServices::shutDown() {
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
     listener_.invalidateConnections();
+  if (windows_) windows_->invalidateConnections();
   // What a client passed may keep a thread (the reading or closing of a file, of a socket) for as long as it likes, and a
   // large batch one that writes and compresses it.
   const bool workersEnd = system_.workers.shutDownWithin(deadline.left() + kCancelGrace);

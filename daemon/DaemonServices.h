@@ -13,6 +13,7 @@
 #include "config/DeviceIdentity.h"
 #include "config/Environment.h"
 #include "config/StorebagFetcher.h"
+#include "daemon/Administration.h"
 #include "daemon/DaemonPlatform.h"
 #include "daemon/ReportingdAgent.h"
 #include "platform/base/Mutex.h"
@@ -28,10 +29,17 @@ namespace kyt {
 
 class DaemonServices {
  public:
+  // What administrators look through.
+  struct WindowStart {
+    std::string version;
+    AdministrationAccess access;
+    std::unique_ptr<StreamAcceptor> acceptor;  // null: there is no window
+  };
   struct Start {
     DaemonPlatform::Start system;
     std::string messageLogs;  // folder
     std::unique_ptr<StreamAcceptor> acceptor;
+    WindowStart window;
     bool socketActivated = false;
     // The daemon has been idle for long enough and nothing is outstanding. Any thread.
     std::function<void()> idle;
@@ -61,6 +69,8 @@ class DaemonServices {
   void endSessions(const Deadline& deadline);
   void waitForRequests(const Deadline& deadline);
   void logFigures();
+  [[nodiscard]] AdministrationSources administrationSources(std::string version, ProgramInspector& inspector);
+  [[nodiscard]] DBusServerServices serverServices();
 
   const Settings& settings_;
   Log& log_;
@@ -82,6 +92,8 @@ class DaemonServices {
   LinuxProcessTransaction transaction_;
   ReportingdAgent agent_;
   DBusServer listener_;
+  Administration administration_;
+  std::optional<DBusServer> windows_;  // connections there neither count nor keep the daemon
   std::optional<Watchdog> watchdog_;
 };
 

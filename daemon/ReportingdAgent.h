@@ -25,6 +25,7 @@
 #include "daemon/RefusedClients.h"
 #include "daemon/SessionCensus.h"
 #include "daemon/SharedDataStore.h"
+#include "daemon/StorebagStandings.h"
 #include "platform/base/Clock.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
@@ -81,6 +82,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
   [[nodiscard]] bool waitUntilSessionsHaveEnded(Duration timeout);
   // Sessions listed now, and hierarchy tokens seen so far. Any thread, without the monitor.
   [[nodiscard]] size_t sessionCount() const { return sessionCount_.load(std::memory_order_relaxed); }
+  [[nodiscard]] const StorebagStandings& storebags() const { return storebags_; }
   [[nodiscard]] size_t hierarchyTokenCount() const { return tokenCount_.load(std::memory_order_relaxed); }
 
  private:
@@ -127,6 +129,7 @@ class ReportingdAgent final : public ListenerDelegate, public ReportingdSessionD
 
   // Self-synchronised.
   RefusedClients refusedClients_;
+  StorebagStandings storebags_;
   std::atomic<size_t> sessionCount_{0};
   std::atomic<size_t> tokenCount_{0};
   std::atomic<bool> stopping_{false};

@@ -106,6 +106,18 @@ std::optional<Dictionary> ReportingdAgent::fetchAndCacheStorebag(int32_t clientT
   entry.set(kFetchState, failed ? kFailure : kSuccessful);
   entry.set(kMaxAge, fetch.maxAge);
   if (fetch.lastModified) entry.set(kLastModified, std::move(*fetch.lastModified));
+  const auto now = static_cast<int64_t>(configuration_.platform.clock.timeOfDay().asSeconds());
+  const std::optional<String> version = stringEntry(entry, kVersion);
+  storebags_.publish({.name = name->str(),
+                      .version = version ? version->str() : std::string(),
+                      .address = std::move(fetch.address),
+                      .fetched = now,
+                      .expires = now + (failed ? kStorebagRetrySeconds : fetch.maxAge),
+                      .state = failed                  ? StorebagView::State::failed
+                               : fetch.problem.empty() ? StorebagView::State::good
+                                                       : StorebagView::State::fallback,
+                      .lastError = fetch.problem,
+                      .lastErrorAt = fetch.problem.empty() ? 0 : now});
   std::optional<Dictionary> section = sectionOf(entry);
   _cachedStorebags.set(*name, std::move(entry));
   cachedStorebagsSize_.reset();

@@ -9,6 +9,7 @@ int main(int argc, char** argv) {
   CLI::App app("Collects telemetry events from client processes and delivers them to reporting back ends",
                "kytreportingd");
   kyt::DaemonOptions options;
+  options.version = kyt::programVersion();
   std::string level;
   bool checkConfig = false;
   kyt::addCommonOptions(app);

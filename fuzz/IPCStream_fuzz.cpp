@@ -1,5 +1,5 @@
-// The server's stream: a handshake and messages, in pieces, on a stream in memory. The first byte says
-// whether a good handshake comes before the input and how the rest is cut; then the connection must end or go
+// The server's stream: a handshake and messages, in pieces, on a stream in memory. The first byte says whether a
+// good handshake comes before the input, how the rest is cut, and whether the socket is clients' or administrators'; then the connection must end or go
 // on, answer only well-formed messages, and close every descriptor.
 #include <cstddef>
 #include <cstdint>
@@ -16,7 +16,10 @@
 #include "platform/fake/ManualTimers.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/fake/MemoryStream.h"
+#include "platform/ipc/AdministrationDispatcher.h"
+#include "platform/ipc/AdministrationInterface.h"
 #include "platform/ipc/BodyValidator.h"
+#include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageReader.h"
@@ -51,6 +54,17 @@ class EchoingSession final : public ClientSessionInterface {
   void setDigestKey(Data, int32_t) override {}
 };
 
+class EmptyWindow final : public AdministrationInterface {
+ public:
+  const char* refusal() const override { return nullptr; }
+  Dictionary status() override { return {{"pid", 1}}; }
+  std::vector<Dictionary> sessions() override { return {{{"user", 1}}, {}}; }
+  std::vector<Dictionary> books() override { return {}; }
+  std::vector<Dictionary> storebags() override { return {}; }
+  std::string metrics() override { return "# EOF\n"; }
+  std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
+};
+
 class NoEntitlements final : public Entitlements {
  public:
   Value valueFor(const PeerCredentials&, std::string_view) override { return {}; }
@@ -59,11 +73,15 @@ class NoEntitlements final : public Entitlements {
 class Delegate final : public ListenerDelegate {
  public:
   bool listenerShouldAcceptNewConnection(Listener&, const std::shared_ptr<Connection>& connection) override {
-    connection->setExportedObject(std::make_shared<EchoingSession>());
+    if (administers)
+      connection->setExportedObject(std::make_shared<EmptyWindow>());
+    else
+      connection->setExportedObject(std::make_shared<EchoingSession>());
     connection->setInvalidationHandler([this] { ++invalidations; });
     connection->resume();
     return true;
   }
+  bool administers = false;
   int invalidations = 0;
 };
 
@@ -103,9 +121,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   pipe->credentials.uid = 0;
   auto acceptor = std::make_unique<MemoryAcceptor>();
   acceptor->waiting.push_back(std::make_unique<MemoryStream>(pipe, kStream));
-  DBusServer server(
-      {limits, counters, log, clock, timers, executor, reactor, entitlements, budget, std::string(32, 'f')},
-      std::move(acceptor));
+  delegate.administers = (data[0] & 8) != 0;
+  std::shared_ptr<const MessageDispatcher> dispatcher;
+  if (delegate.administers)
+    dispatcher = std::make_shared<AdministrationDispatcher>(counters, std::string(32, 'f'));
+  DBusServer server({limits, counters, log, clock, timers, executor, reactor, entitlements, budget,
+                     std::string(32, 'f'), dispatcher},
+                    std::move(acceptor));
   server.setDelegate(delegate);
   server.resume();
   require(reactor.report(MemoryAcceptor::kDescriptor, ready::readable));

@@ -11,6 +11,7 @@
 #include "platform/UserDefaults.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
+#include "platform/base/TextEscape.h"
 #include "platform/objects/Base64.h"
 #include "platform/objects/Description.h"
 #include "platform/objects/Keys.h"
@@ -58,6 +59,12 @@ ReportingdSession::ReportingdSession(ReportingdSessionDelegate& delegate,
   class_.deviceIdentity().deviceUniqueIDCString(_deviceid.data(), kDeviceIDSize);
   _sessionIDString = base64(platform().random.uuidBytes());
   _connectivityHelper = ReportingSessionConnectivityHelper::init(platform().urlSessions);
+  SessionView first;
+  first.user = peerUser_;
+  first.process = _connection->peerProcess();
+  first.identifier = _sessionIDString.str();
+  first.since = static_cast<int64_t>(platform().clock.timeOfDay().asSeconds());
+  standing_ = class_.standings().add(std::move(first));
   log().debug("initWithSessionDelegate: Initialized session with UUID %s", _sessionIDString.c_str());
 }
 
@@ -122,10 +129,34 @@ void ReportingdSession::setSessionInfo(Dictionary sessionInfo, std::optional<Dic
 // What the books know of the session. Events that came before belong to the program that it was then.
 void ReportingdSession::identifyProgram() {
   ReportingProgram program = programOf(peerUser_, clientType(), _userInfo);
-  if (program_ != nullptr && *program_ == program) return;
+  if (program_ != nullptr && *program_ == program) return publishIdentity();
   program_ = std::make_shared<const ReportingProgram>(std::move(program));
   withoutBackend_ = {};
   for (const auto& [key, backend] : _backends) backend->setProgram(program_);
+  publishIdentity();
+}
+
+void ReportingdSession::publishIdentity() {
+  if (standing_ == nullptr) return;
+  const std::optional<String> token = hierarchyToken();
+  standing_->publish([&](SessionView& view) {
+    view.sessionID = _sessionID;
+    view.clientType = clientType();
+    view.clientName = program_ != nullptr ? shownName(program_->clientName) : std::string();
+    view.service = program_ != nullptr ? shownName(program_->service) : std::string();
+    view.token = token ? shownName(beginningOf(token->view())) : std::string();
+    view.level = hierarchyLevel();
+  });
+}
+
+void ReportingdSession::publishBackends() {
+  if (standing_ == nullptr) return;
+  std::vector<std::shared_ptr<const BackEndStanding>> backEnds;
+  for (const auto& [key, backend] : _backends) backEnds.push_back(backend->standing());
+  standing_->publish([&](SessionView& view) {
+    std::swap(view.backEnds, backEnds);
+    view.storebagVersion = _storebagVersion ? shownName(_storebagVersion->view()) : std::string();
+  });
 }
 
 // Little of it counts with the connection. A client whose user has no room for it goes.
@@ -176,6 +207,7 @@ void ReportingdSession::createBackendsWithStorebag(const Dictionary& storebag) {
     MonitorLock lock(_sessionDelegate.monitor());
     std::swap(_backends, backends);
   }
+  publishBackends();
   figuresMayHaveChanged();
   for (const auto& [key, backend] : backends) backend->cleanup();
 }
@@ -312,6 +344,7 @@ void ReportingdSession::dealloc() {
   // Requests that were started complete all the same.
   _connectivityHelper.reset();
   information_.clear();
+  standing_.reset();
 }
 
 }  // namespace kyt

@@ -127,6 +127,8 @@ class ReportingdSession final : public ClientSessionInterface,
   void figuresMayHaveChanged();
   void countInformation();
   void identifyProgram();
+  void publishIdentity();
+  void publishBackends();
   void createBackendsWithStorebag(const Dictionary& storebag);
   void updateSessionWithDefaultSessionInfo();
   void sendStartMessage();
@@ -189,6 +191,7 @@ class ReportingdSession final : public ClientSessionInterface,
   std::atomic<bool> wasInHierarchy_{false};  // a session that drops its token stays where it is registered
 
   // Touched on the connection's queue alone.
+  std::shared_ptr<SessionStanding> standing_;  // until dealloc()
   std::optional<Dictionary> _userInfo;
   Value _frameworks;             // kept for the session's life; nothing here reads it
   Dictionary _periodicServices;  // nothing here fills it

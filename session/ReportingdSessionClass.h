@@ -14,6 +14,7 @@
 #include "platform/base/Books.h"
 #include "platform/base/Mutex.h"
 #include "platform/objects/Value.h"
+#include "session/SessionStanding.h"
 
 namespace kyt {
 
@@ -38,6 +39,8 @@ class ReportingdSessionClass {
   [[nodiscard]] DeviceIdentity& deviceIdentity() const { return configuration_.deviceIdentity; }
   [[nodiscard]] BackendFactory& backendFactory() const { return backendFactory_; }
   [[nodiscard]] MessageLog& messageLog() const { return messageLog_; }
+  // How all sessions stand. Any thread.
+  [[nodiscard]] SessionStandings& standings() { return standings_; }
   [[nodiscard]] Mutex& lock() RETURN_CAPABILITY(lock_) { return lock_; }
 
   // Sends one event without a configured session: builds back ends for it alone and discards them afterwards.
@@ -58,6 +61,7 @@ class ReportingdSessionClass {
   Configuration configuration_;
   BackendFactory& backendFactory_;
   MessageLog& messageLog_;
+  SessionStandings standings_;
   Mutex lock_;
   std::shared_ptr<ReportingSessionConnectivityHelper> singleMessageHelper_ GUARDED_BY(lock_);
 };

@@ -62,10 +62,10 @@ void ReportingdSession::syncReportingStates() {
     if (backend->state() == kBackendStateHeld) continue;
     const KYTReportingBackend* parentBackend = parent->backendForKey(key);
     if (parentBackend == nullptr) {
-      backend->setState(kBackendStateDisabled);
+      backend->setState(kBackendStateDisabled, StateRule::parent);
       continue;
     }
-    backend->setState(parentBackend->state());
+    backend->setState(parentBackend->state(), StateRule::parent);
     backend->setSamplingThreshold(parentBackend->samplingThreshold());
     // The prefix is the same for every kind of back end, deliberately: log readers look for it.
     log().debug("HTTPSPostBackend(syncReportingStates): %s: state and sampling rate updated to %d, %.02f%%",

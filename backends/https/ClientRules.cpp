@@ -117,6 +117,7 @@ int32_t ClientRules::decide(Decision& decision, const Dictionary* userInfo, std:
   decision.samplingThreshold.reset();
   decision.eventWhitelist.reset();
   decision.eventBlacklist.reset();
+  rule_ = StateRule::none;
   if (!facts_.clients) return kBackendStateDisabled;
   Client client;
   if (userInfo != nullptr)
@@ -125,13 +126,16 @@ int32_t ClientRules::decide(Decision& decision, const Dictionary* userInfo, std:
   applyExpedite(decision, client);
   if (!facts_.session->requireUserInfo) return enableWithoutUserInfo(decision);
   if (!judged("user-information", userInfo != nullptr && !userInfo->empty(),
-              userInfo != nullptr ? Value(*userInfo) : Value()))
+              userInfo != nullptr ? Value(*userInfo) : Value())) {
+    rule_ = StateRule::userInformation;
     return kBackendStateUndecided;
+  }
   const std::optional<String> known = platform_.deviceProperties.countryCode();
   const String* country = known ? &*known : nullptr;
   const Dictionary* entry = chosenEntry(client);
   if (entry == nullptr)
-    tellWhyNot(Reason::clientNotListed, client, "no entry of the storebag is for this client");
+    tellWhyNot(Reason::clientNotListed, StateRule::client, client,
+               "no entry of the storebag is for this client");
   if (entry == nullptr || !passesRules(decision, *entry, client, country)) return kBackendStateDisabled;
   const int32_t state = decideBySampling(decision, *entry, client, country);
   takeSettings(decision, *entry, client, state, owner);
@@ -189,6 +193,7 @@ bool ClientRules::passesRules(Decision& decision, const Dictionary& entry, const
   const Array* filters = entry.array("filters");
   if (!judged("filters", filters != nullptr, valueOf(filters))) {
     platform_.log.error("HTTPSPostBackend(updateBackendState): filters are required.");
+    rule_ = StateRule::filters;
     return false;
   }
   decision.filters.createFiltersFromArray(*filters);
@@ -206,7 +211,7 @@ bool ClientRules::passesConsent(Decision& decision, const Dictionary& entry, con
   decision.dnuType = 0;
   if (facts_.dnuEnabled) return true;
   platform_.log.debug("HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.", overrideDnu);
-  tellWhyNot(Reason::consentMissing, client, "the user has not given consent");
+  tellWhyNot(Reason::consentMissing, StateRule::consent, client, "the user has not given consent");
   return false;
 }
 
@@ -219,7 +224,8 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s",
                 shown(country).c_str(), shown(locales).c_str());
-    tellWhyNot(Reason::countryNotListed, client, "the storebag's entry does not list this country");
+    tellWhyNot(Reason::countryNotListed, StateRule::country, client,
+               "the storebag's entry does not list this country");
     return false;
   }
   const String* family = facts_.session->productFamily ? &*facts_.session->productFamily : nullptr;
@@ -228,7 +234,8 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s",
                 shown(family).c_str(), shown(devices).c_str());
-    tellWhyNot(Reason::deviceNotListed, client, "the storebag's entry does not list this device");
+    tellWhyNot(Reason::deviceNotListed, StateRule::device, client,
+               "the storebag's entry does not list this device");
     return false;
   }
   const String* hardware = facts_.session->hardwareType ? &*facts_.session->hardwareType : nullptr;
@@ -238,7 +245,8 @@ bool ClientRules::passesLists(const Dictionary& entry, const Client& client, con
     if (log.debugEnabled())
       log.debug("HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s",
                 shown(hardware).c_str(), shown(excluded).c_str());
-    tellWhyNot(Reason::deviceNotListed, client, "the storebag's entry excludes this device");
+    tellWhyNot(Reason::deviceNotListed, StateRule::device, client,
+               "the storebag's entry excludes this device");
     return false;
   }
   return true;
@@ -260,11 +268,12 @@ int32_t ClientRules::decideBySampling(Decision& decision, const Dictionary& entr
   judged("sampling", !threshold.isNull() && facts_.samplingFactor <= threshold.doubleValue(),
          facts_.samplingFactor, threshold);
   if (threshold.isNull()) {
-    tellWhyNot(Reason::samplingThresholdMissing, client, "the storebag's entry has no sampling_threshold");
+    tellWhyNot(Reason::samplingThresholdMissing, StateRule::threshold, client,
+               "the storebag's entry has no sampling_threshold");
     return kBackendStateDisabled;
   }
   if (facts_.samplingFactor <= threshold.doubleValue()) return kBackendStateEnabled;
-  tellWhyNot(Reason::sampledOut, client, "this session was not drawn");
+  tellWhyNot(Reason::sampledOut, StateRule::sampling, client, "this session was not drawn");
   const Value* second = entry.find("override_sampling");
   decision.overrideSampling = second != nullptr ? *second : Value();
   // "Greater than" and no other test: an override that is not a number holds the back end.
@@ -300,7 +309,8 @@ void ClientRules::takeSettings(Decision& decision, const Dictionary& entry, cons
 }
 
 // Each decision's own line is at the debug level; whoever runs the device sees one a minute without it.
-void ClientRules::tellWhyNot(Reason reason, const Client& client, const char* why) const {
+void ClientRules::tellWhyNot(Reason reason, StateRule rule, const Client& client, const char* why) const {
+  rule_ = rule;
   if (!platform_.counters.addAndMayLog(reason, platform_.clock.monotonic())) return;
   platform_.log.normal("HTTPSPostBackend(updateBackendState): %s posts nothing of %s:%s, since %s",
                        facts_.name.c_str(), shown(client.name).c_str(), shown(client.service).c_str(), why);

@@ -8,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "backend/BackEndStanding.h"
 #include "backend/SessionFacts.h"
 #include "backends/https/Decision.h"
 #include "backends/https/RuleWitness.h"
@@ -36,6 +37,9 @@ class ClientRules {
   // The new state; the rest goes into the decision. `userInfo` may be null. `owner` is the user who gets a new custom
   // identifier.
   [[nodiscard]] int32_t decide(Decision& decision, const Dictionary* userInfo, std::optional<uint32_t> owner);
+
+  // What the latest decision came of.
+  [[nodiscard]] StateRule rule() const { return rule_; }
 
   // The steps that are operations of their own. Whether "post_url" was taken from this client entry.
   bool updatePostLink(Decision& decision, const Dictionary& client) const;
@@ -67,13 +71,14 @@ class ClientRules {
     if (witness_ != nullptr) witness_->judged(rule, passes, value, wanted);
     return passes;
   }
-  void tellWhyNot(Reason reason, const Client& client, const char* why) const;
+  void tellWhyNot(Reason reason, StateRule rule, const Client& client, const char* why) const;
   [[nodiscard]] String getPersistentIdentifierForCustomClientIDSuffix(const Client& client,
                                                                       std::optional<uint32_t> owner);
 
   Platform& platform_;
   const Facts facts_;
   RuleWitness* witness_ = nullptr;
+  mutable StateRule rule_ = StateRule::none;
   // The custom identifiers that were made by their keys: one that cannot be stored must not change.
   std::vector<std::pair<std::string, String>> madeIdentifiers_;
 };

@@ -92,6 +92,7 @@ HTTPSPostBackend::~HTTPSPostBackend() {
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
   if (!batch_.exists()) return;
   const EventBatch::Taken batch = batch_.take(combinedSessionIDOnQueue());
+  standing()->setBatch(0, 0);
   giveBackToUser(batch.bytes);
   batch.events.drop(platform().counters, Reason::batchDiscarded);
   tellDiscarded(batch.records.size(),
@@ -119,7 +120,8 @@ bool HTTPSPostBackend::lacksUserInfo() const {
 void HTTPSPostBackend::updateState() {
   // A frozen state is not even written again: a reply may be disabling the back end at this moment.
   if (immutable_) return;
-  setState(updateBackendState());
+  const int32_t state = updateBackendState();
+  setState(state, rules_.rule());
 }
 
 int32_t HTTPSPostBackend::updateBackendState() {
@@ -190,7 +192,7 @@ Value HTTPSPostBackend::sendMessage(Dictionary message, const TimeValue& timesta
       records_.record(std::move(payload), {timestamp, method, respCode, eventNumber()}, sessionID, room);
   prepareEventForMessage(record, frameworkData);
   // This message is deliberately still handled with the old state: it is the last of the batch that it frees.
-  if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled);
+  if (isExpedite(flag) && oldState == kBackendStateHeld) setState(kBackendStateEnabled, StateRule::expedite);
   platform().log.debug("HTTPSPostBackend(sendMessage): realtime is %d", isRealtime(flag));
   const bool undecided = oldState == kBackendStateUndecided || oldState == kBackendStateHeld;
   if (undecided || (!isRealtime(flag) && batchEvents()) || lacksUserInfo()) {
@@ -306,6 +308,7 @@ std::optional<OutgoingPost> HTTPSPostBackend::newPost(MessageFlag flag, std::opt
   }
   OutgoingPost post{PostRequest(configuration_, postFacts()), *url, std::nullopt, connectivityDelegate(),
                     PostReply{weak_from_this(),
+                              PostStanding(standing(), events.size()),
                               platform(),
                               name(),
                               std::move(completion),

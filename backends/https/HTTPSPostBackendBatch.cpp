@@ -67,6 +67,7 @@ Value HTTPSPostBackend::batchEvent(Dictionary record) {
   stateQueue().async([this, record = std::move(record), method, count, bytes, booked = tally()]() mutable {
     stateQueue().assertCurrent();
     batch_.append(std::move(record), method, count + 1, bytes, combinedSessionIDOnQueue(), booked);
+    standing()->setBatch(batch_.size(), batch_.bytes());
   });
   return flushed;
 }
@@ -108,6 +109,7 @@ HTTPSPostBackend::BatchTaking HTTPSPostBackend::takeBatchOnQueue(EventBatch::Tak
   const bool enabled = stateOnQueue() == kBackendStateEnabled;
   if (enabled && lacksUserInfo()) return BatchTaking::userInfoMissing;
   batch = batch_.take(combinedSessionIDOnQueue());
+  standing()->setBatch(0, 0);
   return enabled ? BatchTaking::taken : BatchTaking::discarded;
 }
 

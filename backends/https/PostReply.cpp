@@ -34,6 +34,7 @@ void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> respo
   const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
   tellOwner(response, error);
   const int status = response ? response->status : 0;
+  standing.ended(static_cast<uint32_t>(platform.clock.timeOfDay().asSeconds()), status);
   const bool redirected = status >= 300 && status <= 399;
   const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off
   if (redirected) {
@@ -85,7 +86,7 @@ Error PostReply::disable(int status) const {
   char text[256];
   std::snprintf(text, sizeof text, "backend %s disabled by server %d return code", name.c_str(), status);
   platform.log.normal("postJSONMessage: %s", text);
-  if (const auto alive = backend.lock()) alive->setState(kBackendStateDisabled);
+  if (const auto alive = backend.lock()) alive->setState(kBackendStateDisabled, StateRule::server, status);
   return Error{kKYTReportingErrorDomain, status, text};
 }
 

@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include "backend/KYTReportingBackend.h"
 #include "platform/URLSession.h"
@@ -14,8 +15,28 @@
 
 namespace kyt {
 
+// The part that a post has in how its back end stands: in flight from its making to its answer, or its loss.
+class PostStanding {
+ public:
+  PostStanding(std::shared_ptr<BackEndStanding> standing, size_t events)
+      : standing_(std::move(standing)), events_(events) {
+    standing_->beginPost(events_);
+  }
+  PostStanding(PostStanding&& other) noexcept = default;
+  PostStanding& operator=(PostStanding&&) = delete;
+  ~PostStanding() {
+    if (standing_) standing_->endPost(events_);
+  }
+  void ended(uint32_t now, int status) const { standing_->posted(now, status); }
+
+ private:
+  std::shared_ptr<BackEndStanding> standing_;
+  size_t events_;
+};
+
 struct PostReply {
   std::weak_ptr<KYTReportingBackend> backend;
+  PostStanding standing;
   Platform& platform;
   String name;
   FlushCompletion completion;

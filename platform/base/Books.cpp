@@ -49,6 +49,7 @@ size_t hashOf(const ReportingProgram& program) {
 }  // namespace
 
 struct Books::Row {
+  bool isInternal = false;  // constant once there is a tally
   Number postsBegun{0}, postsEnded{0};
   Number waitsBegun{0}, waitsEnded{0};
   Number batchesLeft{0};
@@ -64,6 +65,10 @@ struct Books::Row {
 };
 
 struct Books::State {
+  explicit State(const Clock* c) : clock(c) {}
+  const Clock* const clock;
+  RecentFates recent;
+
   struct Key {
     ReportingProgram program;
     std::string backEnd;
@@ -111,7 +116,10 @@ Books::Row& Books::State::row(Key key) {
   if (!hasRoom) return otherRow(key.program);
   ++rowsOfPrograms;
   ++ofUser;
-  return rows[std::move(key)];
+  const bool isInternal = key.isInternal;
+  Row& made = rows[std::move(key)];
+  made.isInternal = isInternal;
+  return made;
 }
 
 Books::Row& Books::State::otherRow(const ReportingProgram& program) {
@@ -129,7 +137,8 @@ Books::Row& Books::State::otherRow(const ReportingProgram& program) {
   return found->second;
 }
 
-Books::Books() : state_(std::make_shared<State>()) {}
+Books::Books() : state_(std::make_shared<State>(nullptr)) {}
+Books::Books(const Clock& clock) : state_(std::make_shared<State>(&clock)) {}
 Books::~Books() = default;
 
 std::shared_ptr<Tally> Books::open(const ReportingProgram& program, std::string_view backEnd,
@@ -155,6 +164,10 @@ std::vector<BookRow> Books::snapshot() const {
     row.fill(filled);
   }
   return rows;
+}
+
+FateFigures Books::lastHour() const {
+  return state_->clock != nullptr ? state_->recent.lastHour(state_->clock->monotonic()) : FateFigures();
 }
 
 // Called by open(), which holds the mutex.
@@ -189,11 +202,15 @@ void Tally::endWaiting(size_t events) {
 }
 void Tally::deliver(size_t events) {
   add(row_.delivered, events);
+  if (state_->clock != nullptr && !row_.isInternal)
+    state_->recent.addDelivered(state_->clock->monotonic(), events);
 }
 void Tally::drop(Reason fate, size_t events) {
   const size_t number = fateNumber(fate);
   assert(number < kFates.size());
   add(row_.dropped[number], events);
+  if (state_->clock != nullptr && !row_.isInternal)
+    state_->recent.addDropped(state_->clock->monotonic(), number, events);
 }
 
 BookedEvents BookedEvents::unbooked(size_t events) {

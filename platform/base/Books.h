@@ -22,7 +22,9 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
+#include "platform/base/RecentFates.h"
 
 namespace kyt {
 
@@ -66,6 +68,8 @@ class Tally;
 class Books {
  public:
   Books();
+  // With a clock, which outlives the books and their tallies, there are figures of the last hour too.
+  explicit Books(const Clock& clock);
   ~Books();
   Books(const Books&) = delete;
   Books& operator=(const Books&) = delete;
@@ -77,6 +81,9 @@ class Books {
 
   // All rows, in the order of user, client type, names and back end. Waits for nobody but open() and ends of tallies.
   [[nodiscard]] std::vector<BookRow> snapshot() const;
+
+  // Of the programs' events, not the daemon's own, by back end. Without a clock all 0.
+  [[nodiscard]] FateFigures lastHour() const;
 
  private:
   friend class Tally;

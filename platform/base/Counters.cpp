@@ -24,6 +24,8 @@ const char* reasonName(Reason reason) {
       return "message-timed-out";
     case Reason::messageTooLong:
       return "message-too-long";
+    case Reason::administrationRefused:
+      return "administration-refused";
     case Reason::tooManyConnections:
       return "too-many-connections";
     case Reason::tooManyConnectionsOfUser:

@@ -28,6 +28,7 @@ enum class Reason : uint8_t {
   handshakeTimedOut,
   messageTimedOut,  // … or for a message of which the rest does not come
   messageTooLong,
+  administrationRefused,  // a call at the administration socket by somebody who may not look
   tooManyConnections,
   tooManyConnectionsOfUser,
   tooManyDescriptorsOfUser,  // a connection refused, or ended with its message's descriptors

@@ -87,6 +87,8 @@ struct Limits {
   static constexpr size_t bookRowsForOthers = 128;  // of these, those named "other"
   static constexpr size_t maxBookRowsOfUser = 448;  // … and half of the rest, so no user fills it
   static constexpr size_t maxBookNameBytes = 128;   // what is longer is cut
+  // That one answer to an administrator shows: some 700 bytes each, and two megabytes wait for nobody.
+  static constexpr size_t maxShownSessions = 2048;
 };
 
 }  // namespace kyt

@@ -23,6 +23,7 @@ struct Paths {
   [[nodiscard]] std::string userDefaults() const { return root + "/var/lib/kytreportingd/defaults"; }
   [[nodiscard]] std::string run() const { return root + "/run/kytreportingd"; }
   [[nodiscard]] std::string socket() const { return run() + "/com.vantu.kytreportingd"; }
+  [[nodiscard]] std::string administration() const { return run() + "/admin"; }
   [[nodiscard]] std::string systemLogs() const { return root + "/var/mobile/Library/Logs/Faultbin"; }
   [[nodiscard]] std::string messageLogs() const { return systemLogs() + "/Retired"; }
   [[nodiscard]] std::string plugIns() const { return root + "/System/Library/PrivateFrameworks"; }

@@ -32,6 +32,7 @@ struct Settings {
   LogTarget logTarget = LogTarget::automatic;
   LogLevel logLevel = LogLevel::normal;
   CompressionSettings compression;
+  std::string adminGroup;  // whose members may look at the daemon, by name; empty: none
   friend bool operator==(const Settings&, const Settings&) = default;
 };
 

@@ -1,11 +1,18 @@
 #include "platform/ipc/Admission.h"
 
+#include <algorithm>
+
 namespace kyt {
 
 Value Admission::entitlementValue(std::string_view key) {
   Value value = entitlements_.valueFor(peer_, key);
   refused_ = !value.boolValue();
   return value;
+}
+
+bool Admission::isInGroup(uint32_t group) const {
+  return peer_.gid == group ||
+         std::find(peer_.groups.begin(), peer_.groups.end(), group) != peer_.groups.end();
 }
 
 std::string Admission::advice() const {

@@ -18,6 +18,7 @@ class Admission {
 
   // The value that the client holds under the key; null when it holds none, which counts as a refusal.
   [[nodiscard]] Value entitlementValue(std::string_view key);
+  [[nodiscard]] bool isInGroup(uint32_t group) const;
   // Whether what was asked for last was not granted.
   [[nodiscard]] bool refused() const { return refused_; }
   // For the line about a refusal: which program it was, and what tells why. Asks the system about the client's process.

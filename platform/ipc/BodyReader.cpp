@@ -83,6 +83,17 @@ bool BodyReader::readOptionalDictionary(std::optional<Dictionary>& out) {
   return true;
 }
 
+bool BodyReader::readDictionaries(std::vector<Dictionary>& out) {
+  const uint8_t* end = nullptr;
+  if (!good() || !wire::array<4>(cursor_, end)) return false;
+  std::vector<Dictionary> result;
+  while (cursor_.at < end)
+    if (!wire::readEntries(cursor_, "v", result.emplace_back(), 1)) return false;
+  if (!wire::endOfArray(cursor_, end)) return false;
+  out = std::move(result);
+  return true;
+}
+
 bool BodyReader::readOptionalValue(Value& out) {
   const uint8_t* end = nullptr;
   if (!good() || !wire::array<1>(cursor_, end)) return false;

@@ -8,14 +8,14 @@
 #include "platform/base/Counters.h"
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/BodyValidator.h"
-#include "platform/ipc/ClientSessionReplies.h"
+#include "platform/ipc/CallReply.h"
 #include "platform/ipc/Contract.h"
 #include "platform/ipc/InterfaceDescription.h"
 
 namespace kyt {
 namespace {
 
-using Peer = ClientSessionDispatcher::Peer;
+using Peer = MessageDispatcher::Peer;
 using wire::Method;
 
 // Each operation reads its arguments and, when they are whole, calls the session. A call of an operation
@@ -23,6 +23,10 @@ using wire::Method;
 
 CallReply replyTo(const Message& message, const Peer& peer) {
   return {message, peer.output};
+}
+
+ClientSessionInterface& sessionOf(const Peer& peer) {
+  return static_cast<ClientSessionInterface&>(peer.object);
 }
 
 // Replies with what `body` writes in the form that the contract has for the method.
@@ -42,8 +46,8 @@ void setSessionInfo(const Message& message, const Peer& peer, BodyReader& in) {
   in.readBoolean(aggregation);
   if (in.finish() != BodyStatus::ok) return;
   CallReply reply = replyTo(message, peer);
-  peer.session.setSessionInfo(std::move(sessionInfo), std::move(userInfo), std::move(frameworks),
-                              aggregation);
+  sessionOf(peer).setSessionInfo(std::move(sessionInfo), std::move(userInfo), std::move(frameworks),
+                                 aggregation);
   reply.answerNothing();
 }
 
@@ -55,7 +59,7 @@ StatesReply statesReply(Method method, const Message& message, const Peer& peer)
 
 void startConfig(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() == BodyStatus::ok)
-    peer.session.startConfigWithCompletionHandler(
+    sessionOf(peer).startConfigWithCompletionHandler(
         statesReply(Method::startConfigWithCompletionHandler, message, peer));
 }
 
@@ -63,8 +67,8 @@ void fetchStates(const Message& message, const Peer& peer, BodyReader& in) {
   std::optional<Dictionary> userInfo;
   in.readOptionalDictionary(userInfo);
   if (in.finish() != BodyStatus::ok) return;
-  peer.session.fetchStatesWithUserInfo(std::move(userInfo),
-                                       statesReply(Method::fetchStatesWithUserInfo, message, peer));
+  sessionOf(peer).fetchStatesWithUserInfo(std::move(userInfo),
+                                          statesReply(Method::fetchStatesWithUserInfo, message, peer));
 }
 
 StringReply stringReply(Method method, const Message& message, const Peer& peer) {
@@ -75,7 +79,7 @@ StringReply stringReply(Method method, const Message& message, const Peer& peer)
 
 void fetchDisplayURL(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() == BodyStatus::ok)
-    peer.session.fetchDisplayURL(stringReply(Method::fetchDisplayURL, message, peer));
+    sessionOf(peer).fetchDisplayURL(stringReply(Method::fetchDisplayURL, message, peer));
 }
 
 void sendMessageWithDictionary(const Message& message, const Peer& peer, BodyReader& in) {
@@ -89,12 +93,12 @@ void sendMessageWithDictionary(const Message& message, const Peer& peer, BodyRea
              [&](MessageWriter& out) { out.writeOptionalValue(object); });
     };
   }
-  peer.session.sendMessageWithDictionary(std::move(dictionary), std::move(objectReply));
+  sessionOf(peer).sendMessageWithDictionary(std::move(dictionary), std::move(objectReply));
 }
 
 void flushMessages(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() != BodyStatus::ok) return;
-  peer.session.flushMessagesWithCompletion(
+  sessionOf(peer).flushMessagesWithCompletion(
       [reply = replyTo(message, peer)](const Value& result, const std::optional<Error>& error) mutable {
         answer(reply, Method::flushMessagesWithCompletion, [&](MessageWriter& out) {
           out.writeOptionalValue(result);
@@ -106,7 +110,7 @@ void flushMessages(const Message& message, const Peer& peer, BodyReader& in) {
 void finishSessionGracefully(const Message& message, const Peer& peer, BodyReader& in) {
   if (in.finish() != BodyStatus::ok) return;
   CallReply reply = replyTo(message, peer);
-  peer.session.finishSessionGracefully();
+  sessionOf(peer).finishSessionGracefully();
   reply.answerNothing();
 }
 
@@ -139,18 +143,18 @@ void uploadFile(const Message& message, const Peer& peer, BodyReader& in) {
     in.refuse("the extension is not two descriptors of the message");
     return;
   }
-  peer.session.uploadFileAtPath(std::move(fileURL), std::move(token), std::move(extension),
-                                [reply = replyTo(message, peer)](bool success) mutable {
-                                  answer(reply, Method::uploadFileAtPath,
-                                         [&](MessageWriter& out) { out.writeBoolean(success); });
-                                });
+  sessionOf(peer).uploadFileAtPath(std::move(fileURL), std::move(token), std::move(extension),
+                                   [reply = replyTo(message, peer)](bool success) mutable {
+                                     answer(reply, Method::uploadFileAtPath,
+                                            [&](MessageWriter& out) { out.writeBoolean(success); });
+                                   });
 }
 
 void uploadLogData(const Message& message, const Peer& peer, BodyReader& in) {
   Array logData;
   in.readArray(logData);
   if (in.finish() != BodyStatus::ok) return;
-  peer.session.uploadLogData(
+  sessionOf(peer).uploadLogData(
       std::move(logData),
       [reply = replyTo(message, peer)](bool success, const std::optional<Error>& error) mutable {
         answer(reply, Method::uploadLogData, [&](MessageWriter& out) {
@@ -170,9 +174,9 @@ void sendMessageWithSessionInfo(const Message& message, const Peer& peer, BodyRe
   in.readUInt16(type);
   in.readOptionalDictionary(payload);
   if (in.finish() != BodyStatus::ok) return;
-  peer.session.sendMessageWithSessionInfo(std::move(sessionInfo), std::move(userInfo), category, type,
-                                          std::move(payload),
-                                          stringReply(Method::sendMessageWithSessionInfo, message, peer));
+  sessionOf(peer).sendMessageWithSessionInfo(std::move(sessionInfo), std::move(userInfo), category, type,
+                                             std::move(payload),
+                                             stringReply(Method::sendMessageWithSessionInfo, message, peer));
 }
 
 void updateSharedData(const Message& message, const Peer& peer, BodyReader& in) {
@@ -180,7 +184,7 @@ void updateSharedData(const Message& message, const Peer& peer, BodyReader& in) 
   in.readDictionary(sharedData);
   if (in.finish() != BodyStatus::ok) return;
   CallReply reply = replyTo(message, peer);
-  peer.session.updateSharedDataWithDictionary(std::move(sharedData));
+  sessionOf(peer).updateSharedDataWithDictionary(std::move(sharedData));
   reply.answerNothing();
 }
 
@@ -191,7 +195,7 @@ void updateSharedDataForKey(const Message& message, const Peer& peer, BodyReader
   in.readOptionalValue(value);
   if (in.finish() != BodyStatus::ok) return;
   CallReply reply = replyTo(message, peer);
-  peer.session.updateSharedDataForKey(std::move(key), std::move(value));
+  sessionOf(peer).updateSharedDataForKey(std::move(key), std::move(value));
   reply.answerNothing();
 }
 
@@ -202,7 +206,7 @@ void setDigestKey(const Message& message, const Peer& peer, BodyReader& in) {
   in.readInt32(algorithm);
   if (in.finish() != BodyStatus::ok) return;
   CallReply reply = replyTo(message, peer);
-  peer.session.setDigestKey(std::move(key), algorithm);
+  sessionOf(peer).setDigestKey(std::move(key), algorithm);
   reply.answerNothing();
 }
 
@@ -235,46 +239,17 @@ const wire::MethodContract* methodNamed(std::string_view member) {
   return nullptr;
 }
 
-bool isStandardInterface(std::string_view interface) {
-  return interface == wire::kPeerInterface || interface == wire::kIntrospectableInterface ||
-         interface == wire::kPropertiesInterface || interface == wire::kBusName;
-}
-
-// The child of a folder on the way to the session's object ("/" has "com"), or nothing when the path is no
-// such folder.
-std::string_view childOf(std::string_view path) {
-  std::string_view rest = wire::kSessionPath;
-  if (path == "/") {
-    rest.remove_prefix(1);
-  } else {
-    if (path.size() >= rest.size() || rest.substr(0, path.size()) != path || rest[path.size()] != '/')
-      return {};
-    rest.remove_prefix(path.size() + 1);
-  }
-  return rest.substr(0, rest.find('/'));
-}
-
-constexpr const char* kDocumentType =
-    "<!DOCTYPE node PUBLIC \"-//freedesktop//DTD D-BUS Object Introspection 1.0//EN\"\n"
-    " \"http://www.freedesktop.org/standards/dbus/1.0/introspect.dtd\">\n";
-
 }  // namespace
 
 std::string clientSessionIntrospection() {
-  const std::string_view text = interfaceDescription();
-  const size_t begin = text.find("<node ");
-  const std::string_view end = "</interface>";
-  std::string_view rest = text.substr(begin, text.find(end, begin) + end.size() - begin);
-  std::string out = kDocumentType;
-  for (size_t comment = rest.find("<!--"); comment != std::string_view::npos; comment = rest.find("<!--")) {
-    out.append(rest.substr(0, comment));
-    rest.remove_prefix(rest.find("-->", comment) + 3);
-  }
-  return out.append(rest).append("\n</node>\n");
+  return introspectionOf(interfaceDescription());
 }
 
-ClientSessionDispatcher::ClientSessionDispatcher(Counters& counters, ClientSessionDispatcherOptions options)
-    : counters_(counters), options_(std::move(options)) {}
+ClientSessionDispatcher::ClientSessionDispatcher(Counters& counters, std::string machineId)
+    : counters_(counters),
+      standard_(counters, {.interface = wire::kSessionInterface,
+                           .machineId = std::move(machineId),
+                           .introspection = clientSessionIntrospection()}) {}
 
 const char* ClientSessionDispatcher::handle(const Message& message, const Peer& peer) const {
   if (message.type == wire::MessageType::methodCall) return handleCall(message, peer);
@@ -300,91 +275,7 @@ const char* ClientSessionDispatcher::handleCall(const Message& message, const Pe
         return nullptr;
     }
   }
-  bool handled = false;
-  if (const char* problem = handleStandard(message, peer, handled)) return problem;
-  if (handled) return nullptr;
-
-  const bool objectExists =
-      message.path == wire::kSessionPath || !childOf(message.path).empty() || message.path == wire::kBusPath;
-  if (!objectExists) return refuse(message, peer, wire::kErrorUnknownObject, "There is no such object");
-  if (message.interface.empty() || isStandardInterface(message.interface) ||
-      (ours && message.path == wire::kSessionPath)) {
-    return refuse(message, peer, wire::kErrorUnknownMethod, "There is no such method");
-  }
-  return refuse(message, peer, wire::kErrorUnknownInterface, "The object has no such interface");
-}
-
-const char* ClientSessionDispatcher::refuse(const Message& message, const Peer& peer, std::string_view error,
-                                            std::string_view text) const {
-  if (!validateBody(message)) return "the body is malformed";
-  replyTo(message, peer).error(error, text);
-  return nullptr;
-}
-
-const char* ClientSessionDispatcher::handleStandard(const Message& message, const Peer& peer,
-                                                    bool& handled) const {
-  const auto is = [&](std::string_view interface, std::string_view member) {
-    return message.member == member && (message.interface == interface || message.interface.empty());
-  };
-  const auto answerString = [&](std::string_view text) -> const char* {
-    if (!message.body.empty()) {
-      return refuse(message, peer, wire::kErrorInvalidArgs, "the method takes no arguments");
-    }
-    replyTo(message, peer).answer("s", [&](MessageWriter& out) { out.writeString(text); });
-    return nullptr;
-  };
-  handled = true;
-  if (is(wire::kBusName, "Hello")) return answerString(":1." + std::to_string(peer.connectionNumber));
-  if (is(wire::kPeerInterface, "GetMachineId")) return answerString(options_.machineId);
-  if (is(wire::kPeerInterface, "Ping")) {
-    if (!message.body.empty()) {
-      return refuse(message, peer, wire::kErrorInvalidArgs, "the method takes no arguments");
-    }
-    replyTo(message, peer).answerNothing();
-    return nullptr;
-  }
-  if (is(wire::kIntrospectableInterface, "Introspect") &&
-      (message.path == wire::kSessionPath || !childOf(message.path).empty())) {
-    return introspect(message, peer);
-  }
-  if (is(wire::kPropertiesInterface, "GetAll") && message.path == wire::kSessionPath)
-    return getAll(message, peer);
-  handled = false;
-  return nullptr;
-}
-
-const char* ClientSessionDispatcher::introspect(const Message& message, const Peer& peer) const {
-  if (!message.body.empty())
-    return refuse(message, peer, wire::kErrorInvalidArgs, "the method takes no arguments");
-  replyTo(message, peer).answer("s", [&](MessageWriter& out) {
-    if (message.path == wire::kSessionPath) return out.writeString(options_.introspection);
-    std::string text = kDocumentType;
-    text.append("<node>\n  <node name=\"").append(childOf(message.path)).append("\"/>\n</node>\n");
-    out.writeString(text);
-  });
-  return nullptr;
-}
-
-const char* ClientSessionDispatcher::getAll(const Message& message, const Peer& peer) const {
-  BodyReader in(message);
-  std::string_view interface;
-  if (in.hasSignature("s")) in.readStringView(interface);
-  switch (in.finish()) {
-    case BodyStatus::malformed:
-      return in.problem();
-    case BodyStatus::invalidArguments:
-      counters_.add(Reason::invalidArguments);
-      replyTo(message, peer).error(wire::kErrorInvalidArgs, in.problem());
-      return nullptr;
-    case BodyStatus::ok:
-      break;
-  }
-  if (!interface.empty() && interface != wire::kSessionInterface && !isStandardInterface(interface)) {
-    replyTo(message, peer).error(wire::kErrorUnknownInterface, "The object has no such interface");
-  } else {
-    replyTo(message, peer).answer("a{sv}", [](MessageWriter& out) { out.writeEmptyDictionary(); });
-  }
-  return nullptr;
+  return standard_.handle(message, peer);
 }
 
 }  // namespace kyt

@@ -15,6 +15,7 @@
 #include "platform/base/Descriptor.h"
 #include "platform/base/Error.h"
 #include "platform/base/Function.h"
+#include "platform/ipc/Listener.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
@@ -26,9 +27,8 @@ using ResultReply = Function<void(Value, std::optional<Error>)>;
 using SuccessReply = Function<void(bool)>;
 using SuccessErrorReply = Function<void(bool, std::optional<Error>)>;
 
-class ClientSessionInterface {
+class ClientSessionInterface : public ExportedObject {
  public:
-  virtual ~ClientSessionInterface() = default;
   virtual void setSessionInfo(Dictionary sessionInfo, std::optional<Dictionary> userInfo,
                               Value frameworksToCheck, bool hasAggregationBlock) = 0;
   virtual void startConfigWithCompletionHandler(StatesReply reply) = 0;

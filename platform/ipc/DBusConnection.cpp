@@ -93,7 +93,12 @@ std::string DBusConnection::description() const {
   return line;
 }
 
-void DBusConnection::setExportedObject(std::shared_ptr<ClientSessionInterface> object) {
+bool DBusConnection::isPeerInGroup(uint32_t group) const {
+  queue_->assertCurrent();
+  return admission_ && admission_->isInGroup(group);
+}
+
+void DBusConnection::setExportedObject(std::shared_ptr<ExportedObject> object) {
   queue_->assertCurrent();
   exportedObject_ = std::move(object);
 }

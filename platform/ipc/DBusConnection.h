@@ -53,8 +53,10 @@ class DBusConnection final : public Connection,
   [[nodiscard]] Value entitlementValue(std::string_view key) override;
   [[nodiscard]] std::string description() const override;
   [[nodiscard]] uint32_t peerUser() const override { return user_; }
+  [[nodiscard]] int32_t peerProcess() const override { return process_; }
+  [[nodiscard]] bool isPeerInGroup(uint32_t group) const override;
   [[nodiscard]] std::shared_ptr<UserAccount> userAccount() const override { return account_; }
-  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
+  void setExportedObject(std::shared_ptr<ExportedObject> object) override;
   void setInterruptionHandler(Task handler) override;
   void setInvalidationHandler(Task handler) override;
   void resume() override;
@@ -133,7 +135,7 @@ class DBusConnection final : public Connection,
   std::unique_ptr<Stream> stream_ GUARDED_BY(*queue_);
   std::unique_ptr<ServerHandshake> handshake_ GUARDED_BY(*queue_);  // until it is done
   TimerHandle handshakeTimer_ GUARDED_BY(*queue_);
-  std::shared_ptr<ClientSessionInterface> exportedObject_ GUARDED_BY(*queue_);
+  std::shared_ptr<ExportedObject> exportedObject_ GUARDED_BY(*queue_);
   Task interruptionHandler_ GUARDED_BY(*queue_), invalidationHandler_ GUARDED_BY(*queue_);
   KeptBytes kept_ GUARDED_BY(*queue_);
   ReceivedDescriptors descriptors_ GUARDED_BY(*queue_);

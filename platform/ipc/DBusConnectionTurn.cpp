@@ -223,11 +223,11 @@ DBusConnection::Step DBusConnection::handleMessage(std::span<const std::byte> by
       return breakOff(Reason::malformedMessage, problem);
   }
   consumed = frame.size;
-  const char* problem = context_->dispatcher.handle(message, {.session = *exportedObject_,
-                                                              .output = output_,
-                                                              .descriptors = taken,
-                                                              .connectionNumber = number_,
-                                                              .stream = stream_.get()});
+  const char* problem = context_->dispatcher->handle(message, {.object = *exportedObject_,
+                                                               .output = output_,
+                                                               .descriptors = taken,
+                                                               .connectionNumber = number_,
+                                                               .stream = stream_.get()});
   return problem == nullptr ? Step::more : breakOff(Reason::malformedMessage, problem);
 }
 

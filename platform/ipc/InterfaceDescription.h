@@ -1,8 +1,9 @@
-// The text of docs/com.vantu.kytreportingd.xml, built in.
+// The interfaces' descriptions, built in.
 #pragma once
 
 namespace kyt {
 
-[[nodiscard]] const char* interfaceDescription();
+[[nodiscard]] const char* interfaceDescription();       // docs/com.vantu.kytreportingd.xml
+[[nodiscard]] const char* administrationDescription();  // docs/com.vantu.kytreportingd.Administration.xml
 
 }  // namespace kyt

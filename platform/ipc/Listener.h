@@ -8,29 +8,40 @@
 #include <string_view>
 
 #include "platform/base/Function.h"
-#include "platform/ipc/ClientSessionInterface.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
 
+class ClientSessionReplyInterface;
 class SerialQueue;
 class UserAccount;
+
+// What a connection's peer calls: a session (ClientSessionInterface.h) or a window (AdministrationInterface.h), by the
+// socket that it came to.
+class ExportedObject {
+ public:
+  virtual ~ExportedObject() = default;
+};
 
 class Connection {
  public:
   virtual ~Connection() = default;
-  // entitlementValue(), description() and what is set before resume(), which it ends, are called on queue(); the rest by
-  // any thread.
+  // entitlementValue(), isPeerInGroup(), description() and what is set before resume(), which it ends, are called on
+  // queue(); the rest by any thread.
   //
   // The value that the peer holds under an entitlement key; null when it holds none. Only before resume().
   [[nodiscard]] virtual Value entitlementValue(std::string_view key) = 0;
   // One line for logs: what identifies the peer (process, user, executable) and this connection.
   [[nodiscard]] virtual std::string description() const = 0;
   [[nodiscard]] virtual uint32_t peerUser() const = 0;
+  // The number that the peer's process had when it connected; 0: not known.
+  [[nodiscard]] virtual int32_t peerProcess() const { return 0; }
+  // Whether it is the peer's group or one of its supplementary ones, says the kernel. Only before resume().
+  [[nodiscard]] virtual bool isPeerInGroup(uint32_t /*group*/) const { return false; }
   // Where what is kept on the client's behalf is counted; null: nowhere.
   [[nodiscard]] virtual std::shared_ptr<UserAccount> userAccount() const { return nullptr; }
   // Called before resume(). The connection keeps the object until it is invalidated.
-  virtual void setExportedObject(std::shared_ptr<ClientSessionInterface> object) = 0;
+  virtual void setExportedObject(std::shared_ptr<ExportedObject> object) = 0;
   // Run on the connection's queue. An interruption comes before an invalidation when the stream broke in the
   // middle of a message or by an error; the invalidation comes exactly once, last, after every call that was
   // read has been handled, and then both handlers and the exported object are dropped.

@@ -369,6 +369,12 @@ void MessageWriter::writeOptionalDictionary(const std::optional<Dictionary>& val
   endArray(mark);
 }
 
+void MessageWriter::writeDictionaries(std::span<const Dictionary> dictionaries) {
+  const ArrayMark mark = beginArray(4);
+  for (const Dictionary& dictionary : dictionaries) writeEntries(entriesOf(dictionary), 1);
+  endArray(mark);
+}
+
 void MessageWriter::writeOptionalValue(const Value& value) {
   const ArrayMark mark = beginArray(1);
   if (!value.isNull()) writeVariant(value, 1);

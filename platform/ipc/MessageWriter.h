@@ -45,6 +45,8 @@ class MessageWriter {
   void beginCall(uint32_t serial, std::string_view prepared);
   void beginReply(uint32_t serial, uint32_t replySerial, std::string_view signature,
                   std::string_view destination = {}, std::string_view sender = {});
+  void beginSignal(uint32_t serial, std::string_view path, std::string_view interface,
+                   std::string_view member, std::string_view signature);
   // The body is one string, the error's text; complete, end() included.
   bool writeError(uint32_t serial, uint32_t replySerial, std::string_view errorName, std::string_view text,
                   std::string_view destination = {}, std::string_view sender = {});
@@ -60,6 +62,7 @@ class MessageWriter {
   void writeDictionary(std::span<const DictionaryEntry> entries);        // a{sv}, in that order
   void writeEmptyDictionary();                                           // a{sv}
   void writeOptionalDictionary(const std::optional<Dictionary>& value);  // aa{sv}
+  void writeDictionaries(std::span<const Dictionary> dictionaries);      // aa{sv}, of any length
   void writeOptionalValue(const Value& value);                           // av; null: none
   void writeArray(const Array& array);                                   // av, of any length
   void writeOptionalStrings(const std::optional<Array>& strings);        // aas; what is no string is left out

@@ -4,6 +4,7 @@
 
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
+#include "platform/ipc/ClientSessionDispatcher.h"
 #include "platform/ipc/DBusConnection.h"
 
 namespace kyt {
@@ -27,8 +28,9 @@ void ReadBuffers::give(Buffer buffer) {
 
 ServerContext::ServerContext(DBusServerServices given)
     : services(std::move(given)),
-      dispatcher(services.counters,
-                 {.machineId = services.machineId, .introspection = clientSessionIntrospection()}) {}
+      dispatcher(services.dispatcher != nullptr
+                     ? services.dispatcher
+                     : std::make_shared<ClientSessionDispatcher>(services.counters, services.machineId)) {}
 
 std::optional<Reason> ServerContext::admit(UserAccount& user) {
   MutexLock lock(mutex_);

@@ -11,7 +11,7 @@
 
 #include "platform/base/Counters.h"
 #include "platform/base/Mutex.h"
-#include "platform/ipc/ClientSessionDispatcher.h"
+#include "platform/ipc/MessageDispatcher.h"
 
 namespace kyt {
 
@@ -38,6 +38,8 @@ struct DBusServerServices {
   Entitlements& entitlements;
   UserBudget& budget;
   std::string machineId;  // 32 hexadecimal digits; also the server's GUID in the handshake
+  // Null: ClientSessionDispatcher, thus the objects that the delegate exports are sessions.
+  std::shared_ptr<const MessageDispatcher> dispatcher = nullptr;
 };
 
 // Buffers for large reads, lent to a turn: an idle connection holds none. A few stay for the next turns.
@@ -66,7 +68,7 @@ class ServerContext {
   [[nodiscard]] std::vector<std::shared_ptr<DBusConnection>> connections() const;
 
   const DBusServerServices services;
-  const ClientSessionDispatcher dispatcher;
+  const std::shared_ptr<const MessageDispatcher> dispatcher;
   ReadBuffers buffers;
 
  private:

@@ -41,6 +41,9 @@ inline constexpr std::string_view kSessionInterface = "com.vantu.kytreportingd.C
 inline constexpr std::string_view kClientPath = "/com/vantu/kytreportingd/client";
 inline constexpr std::string_view kReplyInterface = "com.vantu.kytreportingd.ClientSessionReplyInterface";
 
+// At the same path, on the administration socket.
+inline constexpr std::string_view kAdministrationInterface = "com.vantu.kytreportingd.Administration";
+
 inline constexpr std::string_view kBusName = "org.freedesktop.DBus";
 inline constexpr std::string_view kBusPath = "/org/freedesktop/DBus";
 inline constexpr std::string_view kPeerInterface = "org.freedesktop.DBus.Peer";
@@ -48,6 +51,7 @@ inline constexpr std::string_view kIntrospectableInterface = "org.freedesktop.DB
 inline constexpr std::string_view kPropertiesInterface = "org.freedesktop.DBus.Properties";
 
 inline constexpr std::string_view kErrorFailed = "org.freedesktop.DBus.Error.Failed";
+inline constexpr std::string_view kErrorAccessDenied = "org.freedesktop.DBus.Error.AccessDenied";
 inline constexpr std::string_view kErrorInvalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
 inline constexpr std::string_view kErrorUnknownMethod = "org.freedesktop.DBus.Error.UnknownMethod";
 inline constexpr std::string_view kErrorUnknownInterface = "org.freedesktop.DBus.Error.UnknownInterface";

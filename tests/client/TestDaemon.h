@@ -12,6 +12,7 @@
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
 #include "platform/fake/MemoryLogSink.h"
+#include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/DBusServer.h"
 #include "platform/linux/base/EpollReactor.h"
 #include "platform/linux/base/LinuxClock.h"

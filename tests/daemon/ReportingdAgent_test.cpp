@@ -150,8 +150,8 @@ class LateConnection final : public Connection, private ClientSessionReplyInterf
   }
   std::string description() const override { return "<late>"; }
   uint32_t peerUser() const override { return 1000; }
-  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override {
-    object_ = std::move(object);
+  void setExportedObject(std::shared_ptr<ExportedObject> object) override {
+    object_ = std::dynamic_pointer_cast<ClientSessionInterface>(std::move(object));
   }
   void setInterruptionHandler(Task handler) override { interruption_ = std::move(handler); }
   void setInvalidationHandler(Task handler) override { invalidation_ = std::move(handler); }

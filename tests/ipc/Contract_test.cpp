@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/ipc/AdministrationDispatcher.h"
 #include "platform/ipc/Contract.h"
 #include "platform/ipc/InterfaceDescription.h"
 #include "platform/ipc/Wire.h"
@@ -17,8 +18,8 @@ struct Described {
 };
 
 // The methods of one interface, in the description's order.
-std::vector<Described> describedMethods(std::string_view interface) {
-  const std::string all = interfaceDescription();
+std::vector<Described> describedMethods(std::string_view interface,
+                                        const std::string& all = interfaceDescription()) {
   const size_t begin = all.find("<interface name=\"" + std::string(interface) + "\">");
   if (begin == std::string::npos) return {};
   const std::string text = all.substr(begin, all.find("</interface>", begin) - begin);
@@ -46,6 +47,17 @@ TEST(Contract, IsWhatTheInterfaceDescriptionSays) {
     EXPECT_EQ(found->signature, method.in) << method.member;
     EXPECT_EQ(found->reply, method.out) << method.member;
     EXPECT_EQ(&wire::contractOf(found->method), found) << method.member;
+  }
+}
+
+TEST(Contract, OfAdministratorsIsWhatTheInterfaceDescriptionSays) {
+  const std::vector<Described> described =
+      describedMethods(wire::kAdministrationInterface, administrationDescription());
+  ASSERT_EQ(described.size(), kAdministrationMethods.size());
+  for (size_t i = 0; i < described.size(); ++i) {
+    EXPECT_EQ(kAdministrationMethods[i].member, described[i].member);
+    EXPECT_EQ(kAdministrationMethods[i].signature, described[i].in) << described[i].member;
+    EXPECT_EQ(kAdministrationMethods[i].reply, described[i].out) << described[i].member;
   }
 }
 

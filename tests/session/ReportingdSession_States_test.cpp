@@ -173,7 +173,7 @@ class LockNotingConnection final : public Connection, private ClientSessionReply
   Value entitlementValue(std::string_view) override { return true; }
   std::string description() const override { return "<noting>"; }
   uint32_t peerUser() const override { return 1000; }
-  void setExportedObject(std::shared_ptr<ClientSessionInterface>) override {}
+  void setExportedObject(std::shared_ptr<ExportedObject>) override {}
   void setInterruptionHandler(Task) override {}
   void setInvalidationHandler(Task) override {}
   void resume() override {}

@@ -80,7 +80,8 @@ inline Help helpOf(const std::string& program, std::vector<std::string> command 
        linesOf(runProgram(std::string(KYT_PROGRAMS) + "/" + program, command).text)) {
     if (!line.starts_with("  ")) commands = line == "Subcommands:";
     std::smatch match;
-    if (commands && std::regex_search(line, match, std::regex("^  ([a-z]+)"))) help.commands.insert(match[1]);
+    if (commands && std::regex_search(line, match, std::regex("^  ([a-z-]+)")))
+      help.commands.insert(match[1]);
     if (!std::regex_search(line, match, std::regex("^  ((?:-[a-z],)?(?:--[a-z-]+)?)"))) continue;
     std::string last;
     for (const std::string& option : matchesIn(match[1], "(--?[a-z][a-z-]*)")) {

@@ -98,6 +98,15 @@ struct SimulateOptions {
 // Tells how many sessions and events of many devices leave by that bag.
 [[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);
 
+// What the running daemon says of itself, in columns or as one JSON object. 3: it does not run.
+[[nodiscard]] int statusCommand(const std::string& root, bool json);
+[[nodiscard]] int sessionsCommand(const std::string& root, bool json);
+[[nodiscard]] int booksCommand(const std::string& root, bool json);
+[[nodiscard]] int storebagsCommand(const std::string& root, bool json);
+[[nodiscard]] int metricsCommand(const std::string& root, bool json);
+// Prints the level, or sets it first.
+[[nodiscard]] int logLevelCommand(const std::string& root, const std::string& level, bool json);
+
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);
 int failed(const std::string& text);

@@ -1,5 +1,8 @@
 // kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
-// consent, shows and erases what is known of the owner, makes keys, signs and checks storebags.
+// consent, shows and erases what is known of the owner, makes keys, signs and checks storebags, and shows how the running
+// daemon stands.
+#include <tuple>
+
 #include "platform/linux/cli/CommandLine.h"
 #include "tools/kytctl/Commands.h"
 
@@ -16,6 +19,7 @@ struct Arguments {
   SimulateOptions simulate;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
+  std::string level;
   bool json = false;
   int status = 0;
 };
@@ -215,6 +219,28 @@ void addStorebag(CLI::App& app, Arguments& a) {
   simulate->callback([&a] { a.status = simulateCommand(a.connection.root, a.simulate); });
 }
 
+void addWindow(CLI::App& app, Arguments& a) {
+  using Command = int (*)(const std::string&, bool);
+  const std::tuple<const char*, const char*, Command> commands[] = {
+      {"status", "Print how the running daemon stands: what left, what is lost and why", statusCommand},
+      {"sessions", "Print the sessions of the running daemon and the states of their back ends",
+       sessionsCommand},
+      {"books", "Print what became of each program's events", booksCommand},
+      {"storebags", "Print which storebags are in force", storebagsCommand},
+      {"metrics", "Print the figures in the OpenMetrics text format", metricsCommand}};
+  for (const auto& [name, what, run] : commands) {
+    CLI::App* command = app.add_subcommand(name, what);
+    command->add_flag("--json", a.json, "Print one JSON object");
+    command->callback([&a, run = run] { a.status = run(a.connection.root, a.json); });
+  }
+  CLI::App* level =
+      app.add_subcommand("log-level", "Print or set from which level on the running daemon logs lines");
+  level->add_option("level", a.level, "The new level, until the daemon ends")
+      ->check(CLI::IsMember({"debug", "default", "error"}));
+  level->add_flag("--json", a.json, "Print one JSON object");
+  level->callback([&a] { a.status = logLevelCommand(a.connection.root, a.level, a.json); });
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -231,6 +257,7 @@ int main(int argc, char** argv) {
   addOwner(app, arguments);
   addEntitlements(app, arguments);
   addStorebag(app, arguments);
+  addWindow(app, arguments);
   if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
   return arguments.status;
 }

@@ -7,7 +7,7 @@ namespace kyt {
 struct FakeConnection::State {
   mutable Mutex mutex;
   std::map<std::string, Value, std::less<>> entitlements GUARDED_BY(mutex);
-  std::shared_ptr<ClientSessionInterface> exportedObject GUARDED_BY(mutex);
+  std::shared_ptr<ExportedObject> exportedObject GUARDED_BY(mutex);
   Task interruptionHandler GUARDED_BY(mutex);
   Task invalidationHandler GUARDED_BY(mutex);
   std::vector<MessageToClient> messages GUARDED_BY(mutex);
@@ -50,6 +50,11 @@ bool FakeConnection::invalidated() const {
 
 std::shared_ptr<ClientSessionInterface> FakeConnection::exportedObject() const {
   MutexLock lock(state_->mutex);
+  return std::dynamic_pointer_cast<ClientSessionInterface>(state_->exportedObject);
+}
+
+std::shared_ptr<ExportedObject> FakeConnection::anyExportedObject() const {
+  MutexLock lock(state_->mutex);
   return state_->exportedObject;
 }
 
@@ -66,7 +71,7 @@ void FakeConnection::interruptNow() {
 
 void FakeConnection::runInvalidation(State& state) {
   Task invalidationHandler, interruptionHandler;
-  std::shared_ptr<ClientSessionInterface> object;
+  std::shared_ptr<ExportedObject> object;
   {
     MutexLock lock(state.mutex);
     if (state.invalidated) return;
@@ -96,7 +101,7 @@ Value FakeConnection::entitlementValue(std::string_view key) {
   return found == state_->entitlements.end() ? Value() : found->second;
 }
 
-void FakeConnection::setExportedObject(std::shared_ptr<ClientSessionInterface> object) {
+void FakeConnection::setExportedObject(std::shared_ptr<ExportedObject> object) {
   MutexLock lock(state_->mutex);
   state_->exportedObject = std::move(object);
 }

@@ -2,6 +2,7 @@
 // object as a client would, breaks or ends the connection, and reads what was sent to the client.
 #pragma once
 
+#include <algorithm>
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -11,6 +12,7 @@
 #include <vector>
 
 #include "platform/base/Mutex.h"
+#include "platform/ipc/ClientSessionInterface.h"
 #include "platform/ipc/Listener.h"
 #include "platform/queues/SerialQueue.h"
 
@@ -33,6 +35,7 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
 
   // What a test prepares and asks.
   void setEntitlement(std::string_view key, Value value);
+  void setGroups(std::vector<uint32_t> groups) { groups_ = std::move(groups); }
   void setUserAccount(std::shared_ptr<UserAccount> account) { account_ = std::move(account); }
   void setDescription(std::string description) { description_ = std::move(description); }
   // From now on sendMessageToClient fails with this (none: succeeds again).
@@ -40,7 +43,8 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
   [[nodiscard]] std::vector<MessageToClient> messagesToClient() const;
   [[nodiscard]] bool resumed() const;
   [[nodiscard]] bool invalidated() const;  // the invalidation handler has run
-  [[nodiscard]] std::shared_ptr<ClientSessionInterface> exportedObject() const;
+  [[nodiscard]] std::shared_ptr<ClientSessionInterface> exportedObject() const;  // where it is one
+  [[nodiscard]] std::shared_ptr<ExportedObject> anyExportedObject() const;
 
   // What a client does. Each runs on queue() before returning (so not from that queue); a call on a
   // connection that has no exported object any more is not made: false.
@@ -61,8 +65,11 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
   [[nodiscard]] Value entitlementValue(std::string_view key) override;
   [[nodiscard]] std::string description() const override { return description_; }
   [[nodiscard]] uint32_t peerUser() const override { return user_; }
+  [[nodiscard]] bool isPeerInGroup(uint32_t group) const override {
+    return std::find(groups_.begin(), groups_.end(), group) != groups_.end();
+  }
   [[nodiscard]] std::shared_ptr<UserAccount> userAccount() const override { return account_; }
-  void setExportedObject(std::shared_ptr<ClientSessionInterface> object) override;
+  void setExportedObject(std::shared_ptr<ExportedObject> object) override;
   void setInterruptionHandler(Task handler) override;
   void setInvalidationHandler(Task handler) override;
   void resume() override;
@@ -81,6 +88,7 @@ class FakeConnection final : public Connection, private ClientSessionReplyInterf
   const uint32_t user_;
   std::shared_ptr<UserAccount> account_;  // none: nothing is counted
   std::string description_;
+  std::vector<uint32_t> groups_;
   const std::shared_ptr<State> state_;  // pending work on the queue outlives the connection
 };
 

@@ -148,6 +148,23 @@ PeerCredentials UnixStream::peer() {
 }
 
 std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bindAt(const std::string& path) {
+  return bindWithMode(path, 0666, std::nullopt);
+}
+
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bindForGroup(
+    const std::string& path, std::optional<uint32_t> group) {
+  // A file's group is its maker's, so no right to give files away is needed. A member that may not take the group for its
+  // own gives it to the file afterwards.
+  const gid_t own = ::getegid();
+  const bool taken = group && *group != own && ::setegid(*group) == 0;
+  auto made = bindWithMode(path, group ? 0660 : 0600, group);
+  if (taken && ::setegid(own) != 0) return systemError("Cannot take the own group again");
+  return made;
+}
+
+// Nobody can connect before listen().
+std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bindWithMode(
+    const std::string& path, unsigned mode, std::optional<uint32_t> group) {
   sockaddr_un address;
   if (!fillAddress(path, address)) {
     return Error{"POSIX", ENAMETOOLONG, "The socket path \"" + path + "\" is empty or longer than 107 bytes"};
@@ -163,9 +180,15 @@ std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> UnixSocketAcceptor::bin
   if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
     return systemError("Cannot bind to \"" + path + "\"");
   }
-  if (::lstat(path.c_str(), &status) != 0 || ::chmod(path.c_str(), 0666) != 0) {
-    return systemError("Cannot open \"" + path + "\" to clients");
-  }
+  if (::lstat(path.c_str(), &status) != 0) return systemError("Cannot find \"" + path + "\" again");
+  const auto refused = [&] {
+    Error error = systemError("Cannot open \"" + path + "\" to clients");
+    ::unlink(path.c_str());
+    return error;
+  };
+  if (group && status.st_gid != *group && ::chown(path.c_str(), static_cast<uid_t>(-1), *group) != 0)
+    return refused();
+  if (::chmod(path.c_str(), mode) != 0) return refused();
   if (::listen(socket.get(), SOMAXCONN) != 0) return systemError("Cannot listen at \"" + path + "\"");
   return std::unique_ptr<UnixSocketAcceptor>(
       new UnixSocketAcceptor(std::move(socket), path, status.st_dev, status.st_ino));

@@ -3,7 +3,9 @@
 // manager.
 #pragma once
 
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <variant>
 
@@ -37,6 +39,10 @@ class UnixSocketAcceptor final : public StreamAcceptor {
   // description is one line for the log.
   [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> bindAt(
       const std::string& path);
+  // The same for root, the process's own user and the members of a group alone: mode 0660, or 0600 without one. Only
+  // before other threads exist, with the right to make files of that group: as root, with CAP_SETGID, or as its member.
+  [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> bindForGroup(
+      const std::string& path, std::optional<uint32_t> group);
   // Takes over the one listening socket that the service manager passed (LISTEN_PID, LISTEN_FDS; both are
   // removed from the environment); null when it passed none. Only before other threads exist.
   [[nodiscard]] static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> adoptActivated();
@@ -50,6 +56,9 @@ class UnixSocketAcceptor final : public StreamAcceptor {
   [[nodiscard]] bool activated() const { return path_.empty(); }
 
  private:
+  static std::variant<std::unique_ptr<UnixSocketAcceptor>, Error> bindWithMode(const std::string& path,
+                                                                               unsigned mode,
+                                                                               std::optional<uint32_t> group);
   UnixSocketAcceptor(Descriptor socket, std::string path, uint64_t device, uint64_t inode)
       : socket_(std::move(socket)), path_(std::move(path)), device_(device), inode_(inode) {}
   const Descriptor socket_;

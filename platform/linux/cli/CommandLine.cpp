@@ -25,6 +25,10 @@ void complain(const CLI::App& app, const std::string& what) {
 
 }  // namespace
 
+const char* programVersion() {
+  return KYT_VERSION;
+}
+
 void addCommonOptions(CLI::App& app) {
   app.set_help_flag("-h,--help", "Print this help and exit");
   app.set_version_flag("--version", app.get_name() + " " KYT_VERSION, "Print the version and exit");

@@ -10,6 +10,9 @@ namespace kyt {
 
 inline constexpr int kWrongUsage = 2;
 
+// What --version says behind the name.
+[[nodiscard]] const char* programVersion();
+
 // Gives the program --help and --version. To be called before subcommands are added, which take --help over.
 void addCommonOptions(CLI::App& app);
 

@@ -16,6 +16,13 @@ void fillStandardDescriptors();
 // The folder that a file is in.
 [[nodiscard]] std::string folderOf(const std::string& path);
 [[nodiscard]] uint32_t currentUser();
+// What the kernel says of this process now; 0 where it says nothing. Any thread.
+struct OwnFigures {
+  int32_t pid = 0;
+  uint64_t residentBytes = 0, anonymousBytes = 0;
+  uint32_t threads = 0;
+};
+[[nodiscard]] OwnFigures ownFigures();
 // Large blocks (a file that is uploaded, a server's long reply) go back to the system when they are freed. Left to
 // itself the allocator keeps more and more of them, for each of its threads, after the first few.
 void giveLargeBlocksBack();

@@ -135,6 +135,14 @@ const char* setCompressionLevel(const TomlNode& node, Settings& settings) {
   return nullptr;
 }
 
+const char* setAdminGroup(const TomlNode& node, Settings& settings) {
+  const std::string* text = node.text();
+  if (text == nullptr || text->empty() || text->find('\0') != std::string::npos)
+    return "must be the name of a group";
+  settings.adminGroup = *text;
+  return nullptr;
+}
+
 // The member that a setting is, wherever in the settings it stands.
 template <auto field, typename Whole>
 auto& memberOf(Whole& settings) {
@@ -213,6 +221,7 @@ constexpr Setting kSettings[] = {
     setting<&Settings::logLevel>("log", "level", setLogLevel, Taking::whileRunning),
     setting<&CompressionSettings::library>("compression", "library", setCompressionLibrary, Taking::atStart),
     setting<&CompressionSettings::level>("compression", "level", setCompressionLevel, Taking::atStart),
+    setting<&Settings::adminGroup>("admin", "group", setAdminGroup, Taking::atStart),
 };
 
 bool isSection(std::string_view name) {

@@ -39,6 +39,7 @@ namespace kyt {
 
 class Counters;
 class Log;
+class ServerRecords;
 class URLNetwork;
 
 struct CurlURLSessionOptions {
@@ -62,6 +63,7 @@ struct CurlURLSessionOptions {
   // thread when no connection is left. No lock held.
   Duration quietTime = std::chrono::seconds(10);
   void (*whenQuiet)() = nullptr;
+  ServerRecords* servers = nullptr;  // is told how each request ended; null: nobody. It outlives the network
 };
 
 class CurlURLSessionFactory final : public URLSessionFactory {

@@ -3,10 +3,12 @@
 #include <strings.h>
 
 #include <algorithm>
+#include <chrono>
 #include <utility>
 #include <variant>
 
 #include "platform/base/Limits.h"
+#include "platform/base/ServerRecords.h"
 #include "platform/linux/base/CodePages.h"
 
 namespace kyt {
@@ -197,7 +199,23 @@ void URLRequests::withdraw(URLTransfer& transfer) {
   transfer.phase = URLTransfer::Phase::submitted;
 }
 
+namespace {
+
+int64_t secondsNow() {
+  return std::chrono::duration_cast<std::chrono::seconds>(std::chrono::system_clock::now().time_since_epoch())
+      .count();
+}
+
+// Whether the failure says something about the server.
+bool isOfTheServer(int32_t code) {
+  return code > 0 && code != CURLE_FAILED_INIT;
+}
+
+}  // namespace
+
 void URLRequests::succeed(URLTransfer& transfer, int status) {
+  if (tools_.options.servers != nullptr)
+    tools_.options.servers->answered(transfer.request.url, status, secondsNow());
   withdraw(transfer);
   transfer.takeReply(status);
   tools_.figures.add(&URLFigures::completed);
@@ -205,6 +223,8 @@ void URLRequests::succeed(URLTransfer& transfer, int status) {
 }
 
 void URLRequests::fail(URLTransfer& transfer, int32_t code, std::string description) {
+  if (tools_.options.servers != nullptr && isOfTheServer(code))
+    tools_.options.servers->failed(transfer.request.url, description, secondsNow());
   transfer.takeError(code, std::move(description));
   withdraw(transfer);
   tools_.figures.add(&URLFigures::failed);

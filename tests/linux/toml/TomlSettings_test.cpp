@@ -33,6 +33,7 @@ TEST(TomlSettings, TheTwoHostsAreEnough) {
   EXPECT_TRUE(settings.cellularInterfaces.empty());
   EXPECT_EQ(settings.logTarget, LogTarget::automatic);
   EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::zlib, 6}));
+  EXPECT_EQ(settings.adminGroup, "");
   const Limits defaults;
   EXPECT_EQ(settings.limits.maxMessageBytes, defaults.maxMessageBytes);
   EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 16777216u);
@@ -78,6 +79,8 @@ level = "debug"
 [compression]
 library = "libdeflate"
 level = 9
+[admin]
+group = "adm"
 )");
   EXPECT_EQ(settings.logLevel, LogLevel::debug);
   EXPECT_EQ(settings.caFile, "/etc/ca.pem");
@@ -98,6 +101,7 @@ level = 9
   EXPECT_EQ(settings.limits.shutdownGraceSeconds, 2.0);
   EXPECT_EQ(settings.logTarget, LogTarget::standardError);
   EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::libdeflate, 9}));
+  EXPECT_EQ(settings.adminGroup, "adm");
 }
 
 TEST(TomlSettings, AHostsTrailingSlashIsDropped) {
@@ -181,6 +185,9 @@ TEST(TomlSettings, WrongTypesAndNumbersOutOfRangeAreErrorsWithTheirLine) {
   for (const char* level : {"0", "10", "-1", "5.0", "\"5\""})
     EXPECT_EQ(other(std::string("[compression]\nlevel = ") + level + "\n"),
               "k.toml:5: \"compression.level\" must be a whole number from 1 to 9");
+  for (const char* group : {"4", "\"\"", "[]"})
+    EXPECT_EQ(other(std::string("[admin]\ngroup = ") + group + "\n"),
+              "k.toml:5: \"admin.group\" must be the name of a group");
   EXPECT_EQ(other("[tls]\nca_file = \"ca.pem\"\n"),
             "k.toml:5: \"tls.ca_file\" must be the absolute path of a file");
   EXPECT_EQ(other("[network]\ncellular_interfaces = \"wwan0\"\n"),

@@ -1,5 +1,5 @@
-// The one reply to one call. Replies are handed to a session as functions that own a CallReply; whoever drops
-// such a function uncalled answers the client "Failed". Only the dispatcher uses this.
+// The one reply to one call. Replies are handed to a session or window as functions that own a CallReply; whoever drops
+// such a function uncalled answers the client "Failed". Only the dispatchers use this.
 #pragma once
 
 #include <cstdint>
@@ -43,6 +43,8 @@ class CallReply {
   void error(std::string_view name, std::string_view text) {
     if (const auto output = std::exchange(output_, nullptr)) sendError(*output, name, text);
   }
+  // Nothing is answered: the connection ends.
+  void forget() { output_.reset(); }
 
  private:
   void sendError(ConnectionOutput& output, std::string_view name, std::string_view text) const {

@@ -1,0 +1,78 @@
+// The window of administrators: accepts connections of the administration socket and answers their questions from what
+// others publish (books, standings of sessions and storebags, records of servers, counters). It waits for no session, owns
+// nothing that sessions use, and its connections neither start the daemon nor keep it running.
+//
+// Made by the composition root, which it does not outlive; everything in the sources outlives it. Any thread.
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/base/ServerRecords.h"
+#include "platform/ipc/AdministrationInterface.h"
+#include "platform/ipc/Listener.h"
+#include "platform/objects/Value.h"
+
+namespace kyt {
+
+class SessionStandings;
+class StorebagStandings;
+struct Platform;
+
+// What the system says of the daemon's process; 0 where it does not.
+struct ProcessFigures {
+  int32_t pid = 0;
+  uint64_t residentBytes = 0, anonymousBytes = 0;
+  uint32_t threads = 0;
+};
+
+struct AdministrationSources {
+  Platform& platform;
+  const SessionStandings& sessions;
+  const StorebagStandings& storebags;
+  const ServerRecords& servers;
+  std::string version;
+  int64_t since = 0;  // seconds since 1970
+  // Any thread.
+  std::function<size_t()> connections;
+  std::function<ProcessFigures()> process;
+  // The program that a process runs, empty where that cannot be known; may take seconds once, when nobody answers.
+  std::function<std::string(int32_t)> programOf;
+};
+
+// Who may look, besides root.
+struct AdministrationAccess {
+  uint32_t user = 0;              // the daemon's
+  std::optional<uint32_t> group;  // none: nobody else
+  std::string groupName;
+};
+
+class Administration final : public ListenerDelegate {
+ public:
+  Administration(AdministrationSources sources, AdministrationAccess access);
+
+  // Everybody who reached the socket is taken, so that who may not look is told so.
+  [[nodiscard]] bool listenerShouldAcceptNewConnection(
+      Listener& listener, const std::shared_ptr<Connection>& connection) override;
+
+  // What the window shows, by the interface's description.
+  [[nodiscard]] Dictionary status() const;
+  [[nodiscard]] std::vector<Dictionary> sessions() const;
+  [[nodiscard]] std::vector<Dictionary> books() const;
+  [[nodiscard]] std::vector<Dictionary> storebags() const;
+  [[nodiscard]] std::string metrics() const;
+  [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
+
+ private:
+  class Window;
+  const AdministrationSources sources_;
+  const AdministrationAccess access_;
+  const std::string refusal_;
+};
+
+}  // namespace kyt

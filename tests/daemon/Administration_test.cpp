@@ -1,0 +1,170 @@
+// What administrators see, over sessions with recording back ends: the daemon's own classes behind it are real.
+#include "daemon/Administration.h"
+
+#include "platform/ipc/AdministrationInterface.h"
+#include "tests/daemon/AgentFixture.h"
+
+namespace kyt {
+namespace {
+
+class AdministrationTest : public AgentFixture {
+ protected:
+  AdministrationTest() {
+    windows_.setDelegate(administration_);
+    windows_.resume();
+  }
+  std::shared_ptr<FakeConnection> look(uint32_t user, std::vector<uint32_t> groups = {}) {
+    auto connection =
+        std::make_shared<FakeConnection>(SerialQueue::create("test.window", test_.executor), user);
+    connection->setGroups(std::move(groups));
+    EXPECT_TRUE(windows_.connect(connection));
+    connections_.push_back(connection);
+    return connection;
+  }
+  static const char* refusalOf(const std::shared_ptr<FakeConnection>& connection) {
+    return std::dynamic_pointer_cast<AdministrationInterface>(connection->anyExportedObject())->refusal();
+  }
+  static const Dictionary& backEnd(const Dictionary& session, size_t number = 0) {
+    return *(session.array("backEnds")->begin() + number)->dictionary();
+  }
+
+  ServerRecords servers_;
+  Administration administration_{{.platform = test_.platform,
+                                  .sessions = class_.standings(),
+                                  .storebags = agent_.storebags(),
+                                  .servers = servers_,
+                                  .version = "8.0.0",
+                                  .since = 1000,
+                                  .connections = [] { return size_t{3}; },
+                                  .process =
+                                      [] {
+                                        return ProcessFigures{42, 9 << 20, 3 << 20, 6};
+                                      },
+                                  .programOf = [](int32_t) { return std::string("/usr/bin/program"); }},
+                                 {.user = 500, .group = 4, .groupName = "adm"}};
+  FakeListener windows_;
+};
+
+TEST_F(AdministrationTest, IsForRootTheDaemonsUserAndTheGroupAlone) {
+  EXPECT_EQ(refusalOf(look(0)), nullptr);
+  EXPECT_EQ(refusalOf(look(500)), nullptr);
+  EXPECT_EQ(refusalOf(look(1000, {4})), nullptr);
+  EXPECT_EQ(refusalOf(look(1000, {100, 4})), nullptr);
+  EXPECT_STREQ(
+      refusalOf(look(1000, {100})),
+      "Only root, the daemon's own user and members of the group adm may look at the daemon (admin.group in "
+      "kytreportingd.toml)");
+  EXPECT_NE(refusalOf(look(65534)), nullptr);
+}
+
+TEST_F(AdministrationTest, MakesNoSession) {
+  const auto connection = look(0);
+  EXPECT_EQ(agent_.sessionCount(), 0U);
+  EXPECT_FALSE(transaction_.isOpen());
+}
+
+TEST_F(AdministrationTest, ShowsWhoReports) {
+  Dictionary info = sessionInfoAt(2, "a-token-that-is-long-enough", 77);
+  Client client = connect(true, 1234);
+  client.connection->call([&](ClientSessionInterface& session) {
+    session.setSessionInfo(info, Dictionary{{"ClientName", "video"}, {"ServiceName", "calls"}}, nullptr,
+                           false);
+  });
+  ASSERT_TRUE(configure(client));
+  const std::vector<Dictionary> sessions = administration_.sessions();
+  ASSERT_EQ(sessions.size(), 1U);
+  const Dictionary& session = sessions[0];
+  EXPECT_EQ(session.unsignedInteger("user"), 1234U);
+  EXPECT_EQ(session.unsignedInteger("sessionID"), 77U);
+  EXPECT_EQ(session.integer("clientType"), 7);
+  EXPECT_EQ(*session.string("family"), "QH");
+  EXPECT_EQ(*session.string("client"), "video");
+  EXPECT_EQ(*session.string("service"), "calls");
+  EXPECT_EQ(*session.string("token"), "a-token-...");
+  EXPECT_EQ(session.integer("level"), 2);
+  EXPECT_EQ(*session.string("storebagVersion"), "1.0");
+  EXPECT_EQ(*session.string("session"), client.session->sessionIDString());
+  EXPECT_EQ(*backEnd(session).string("name"), "httppost");
+  EXPECT_EQ(*backEnd(session).string("state"), "enabled");
+  client.connection->invalidateNow();
+  EXPECT_TRUE(administration_.sessions().empty());
+}
+
+TEST_F(AdministrationTest, ShowsWhichRuleDecidedABackEndsState) {
+  Client client = clientWith(sessionInfo());
+  ASSERT_TRUE(configure(client));
+  KYTReportingBackend& backend = *client.session->backendForKey("httppost");
+  test_.clock.setTimeOfDay({5000, 0});
+  backend.setState(kBackendStateDisabled, StateRule::server, 503);
+  test_.clock.setTimeOfDay({6000, 0});
+  backend.setState(kBackendStateDisabled, StateRule::server, 503);  // again: since when stays
+  static_cast<void>(backend.state());
+  const Dictionary shown = backEnd(administration_.sessions()[0]);
+  EXPECT_EQ(*shown.string("state"), "disabled");
+  EXPECT_EQ(*shown.string("rule"), "5xx");
+  EXPECT_EQ(shown.integer("status"), 503);
+  EXPECT_EQ(shown.integer("decided"), 5000);
+  const Dictionary status = administration_.status();
+  const Array* groups = status.array("backEnds");
+  ASSERT_EQ(groups->size(), 1U);
+  EXPECT_EQ(*groups->begin()->dictionary()->string("rule"), "5xx");
+  EXPECT_EQ(groups->begin()->dictionary()->integer("sessions"), 1);
+}
+
+TEST_F(AdministrationTest, ShowsStorebagsWhileTheAgentsMonitorIsHeld) {
+  Client client = clientWith(sessionInfo());
+  ASSERT_TRUE(configure(client));
+  MonitorLock held(agent_.monitor());
+  const std::vector<Dictionary> bags = administration_.storebags();
+  ASSERT_EQ(bags.size(), 1U);
+  EXPECT_EQ(*bags[0].string("name"), "cadmor");
+  EXPECT_EQ(*bags[0].string("version"), "1.0");
+  EXPECT_EQ(*bags[0].string("state"), "good");
+  EXPECT_EQ(*bags[0].string("lastError"), "");
+  EXPECT_GT(bags[0].integer("expires"), bags[0].integer("fetched"));
+}
+
+TEST_F(AdministrationTest, ShowsWhyAStorebagIsNotThere) {
+  serveNothing();
+  Client client = clientWith(sessionInfo(8));
+  EXPECT_FALSE(configure(client));
+  const std::vector<Dictionary> bags = administration_.storebags();
+  ASSERT_EQ(bags.size(), 1U);
+  EXPECT_EQ(*bags[0].string("state"), "failed");
+  EXPECT_EQ(*bags[0].string("version"), "");
+  EXPECT_EQ(*bags[0].string("lastError"), "no such host");
+  EXPECT_NE(bags[0].integer("lastErrorAt"), 0);
+  EXPECT_EQ(bags[0].integer("expires") - bags[0].integer("fetched"), kStorebagRetrySeconds);
+}
+
+TEST_F(AdministrationTest, AddsUpTheBooksOfAllPrograms) {
+  Client client = clientWith(sessionInfo());
+  client.connection->call([](ClientSessionInterface& session) {
+    session.sendMessageWithDictionary(Dictionary{{"Category", 1}, {"Type", 2}}, nullptr);
+  });
+  const Dictionary status = administration_.status();
+  EXPECT_EQ(status.integer("pid"), 42);
+  EXPECT_EQ(status.integer("since"), 1000);
+  EXPECT_EQ(status.integer("sessions"), 1);
+  EXPECT_EQ(status.integer("connections"), 3);
+  EXPECT_EQ(status.integer("taken"), 1);
+  EXPECT_EQ(status.integer("dropped"), 1);
+  EXPECT_EQ(status.dictionary("droppedBy")->integer("not-configured"), 1);
+  const std::vector<Dictionary> rows = administration_.books();
+  ASSERT_EQ(rows.size(), 1U);
+  EXPECT_EQ(*rows[0].string("backEnd"), "-");
+  EXPECT_EQ(rows[0].dictionary("droppedBy")->integer("not-configured"), 1);
+}
+
+TEST_F(AdministrationTest, SetsTheLogLevel) {
+  EXPECT_EQ(administration_.setLogLevel("error"), std::nullopt);
+  EXPECT_FALSE(test_.log.enabled(LogLevel::normal));
+  EXPECT_EQ(*administration_.status().string("logLevel"), "error");
+  EXPECT_NE(administration_.setLogLevel("loud"), std::nullopt);
+  EXPECT_FALSE(test_.log.enabled(LogLevel::normal));
+  EXPECT_EQ(administration_.setLogLevel("debug"), std::nullopt);
+  EXPECT_TRUE(test_.log.debugEnabled());
+}
+
+}  // namespace
+}  // namespace kyt

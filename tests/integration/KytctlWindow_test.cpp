@@ -1,0 +1,245 @@
+// kytctl status, sessions, books, storebags, metrics and log-level against the built daemon: the columns for people and the
+// JSON for programs, of the same daemon.
+#include <gtest/gtest.h>
+
+#include <map>
+#include <regex>
+#include <set>
+#include <sstream>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "platform/linux/data/RapidJSON.h"
+#include "tests/integration/DaemonProcess.h"
+#include "tests/integration/StageFixture.h"
+
+namespace kyt {
+namespace {
+
+std::vector<std::string> linesOf(const std::string& text) {
+  std::vector<std::string> lines;
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) lines.push_back(line);
+  return lines;
+}
+
+size_t characters(const std::string& line) {
+  size_t count = 0;
+  for (const char c : line) count += (static_cast<unsigned char>(c) & 0xC0) != 0x80 ? 1 : 0;
+  return count;
+}
+
+class KytctlWindow : public StageTest {
+ protected:
+  // One object on one line.
+  Dictionary json(std::vector<std::string> command) const {
+    command.emplace_back("--json");
+    const ProgramRun run = kytctl(command);
+    EXPECT_EQ(run.status, 0) << run.text;
+    EXPECT_EQ(linesOf(run.text).size(), 1U) << run.text;
+    auto parsed = RapidJSON().parse(run.text);
+    const auto* value = std::get_if<Value>(&parsed);
+    if (value == nullptr || value->dictionary() == nullptr) {
+      ADD_FAILURE() << "no JSON object: " << run.text;
+      return {};
+    }
+    return *value->dictionary();
+  }
+  // Lines that fit 100 characters and hold nothing that steers a terminal.
+  std::string columns(const std::vector<std::string>& command) const {
+    const ProgramRun run = kytctl(command);
+    EXPECT_EQ(run.status, 0) << run.text;
+    for (const std::string& line : linesOf(run.text)) {
+      EXPECT_LE(characters(line), 100U) << line;
+      for (const char c : line) EXPECT_FALSE(static_cast<unsigned char>(c) < 0x20 || c == 0x7F) << line;
+    }
+    return run.text;
+  }
+  static std::vector<Dictionary> rows(const Dictionary& answer, const char* key) {
+    std::vector<Dictionary> rows;
+    const Array* array = answer.array(key);
+    for (size_t i = 0; array != nullptr && i < array->size(); ++i)
+      rows.push_back(*(array->begin() + i)->dictionary());
+    return rows;
+  }
+  static std::string text(const Dictionary& row, const char* key) {
+    const String* text = row.string(key);
+    return text != nullptr ? text->str() : "(none)";
+  }
+  // Two delivered events, the session's start among them, and one batched.
+  void report(TestClient& client) {
+    EXPECT_EQ(client.configure(), "live: httppost") << daemonLog();
+    EXPECT_TRUE(client.send(5, 1, Dictionary{{"a", 1}}));
+    EXPECT_EQ(client.flush(), "flushed") << daemonLog();
+    EXPECT_TRUE(client.send(6, 1, Dictionary{{"a", 1}}));
+    EXPECT_EQ(client.displayURL(), "https://display.example.org/");  // what was sent before has been handled
+  }
+};
+
+TEST_F(KytctlWindow, TellsHowTheDaemonStandsInBothForms) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  TestClient client(socket(), 7, "a");
+  report(client);
+
+  const Dictionary status = json({"status"});
+  EXPECT_EQ(status.integer("sessions"), 1);
+  EXPECT_EQ(status.integer("delivered"), 1);
+  EXPECT_EQ(status.integer("pending"), 1);
+  EXPECT_EQ(status.integer("taken"), 2);
+  EXPECT_EQ(status.integer("dropped"), 0);
+  EXPECT_EQ(status.dictionary("lastHour")->integer("delivered"), 1);
+  EXPECT_GT(status.integer("threads"), 1);
+  EXPECT_GT(status.integer("memoryBytes"), 1 << 20);
+  const std::vector<Dictionary> servers = rows(status, "servers");
+  ASSERT_FALSE(servers.empty());
+  EXPECT_EQ(servers.back().integer("lastStatus"), 200);
+  const std::vector<Dictionary> inForce = rows(status, "storebags");
+  ASSERT_EQ(inForce.size(), 1U);
+  EXPECT_EQ(text(inForce[0], "version"), "1");
+
+  const std::string shown = columns({"status"});
+  for (const char* line :
+       {"\nclients        1 sessions, 1 connections\n", "\nlast hour      1 delivered, 0 dropped (0.0 %)\n",
+        "\nall            1 delivered, 0 dropped (0.0 %), 1 pending of 2 taken\n",
+        "\nback ends      QH httppost enabled, in 1 sessions\n", "storebags      cadmor version 1 in force"})
+    EXPECT_NE(shown.find(line), std::string::npos) << shown;
+
+  const std::vector<Dictionary> sessions = rows(json({"sessions"}), "sessions");
+  ASSERT_EQ(sessions.size(), 1U);
+  EXPECT_EQ(sessions[0].integer("pid"), ::getpid());
+  EXPECT_EQ(text(sessions[0], "client"), "a");
+  EXPECT_NE(text(sessions[0], "program").find("kyt_tests_integration"), std::string::npos);
+  const Dictionary backEnd = rows(sessions[0], "backEnds").at(0);
+  EXPECT_EQ(text(backEnd, "state"), "enabled");
+  EXPECT_EQ(backEnd.integer("batchedEvents"), 1);
+  EXPECT_EQ(backEnd.integer("inFlight"), 0);
+  EXPECT_EQ(backEnd.integer("lastStatus"), 200);
+  const std::string listed = columns({"sessions"});
+  EXPECT_NE(listed.find("a:test"), std::string::npos) << listed;
+  EXPECT_NE(listed.find("      httppost enabled, 1 events in the batch, 0 in flight, last post "),
+            std::string::npos)
+      << listed;
+
+  const std::vector<Dictionary> books = rows(json({"books"}), "rows");
+  ASSERT_EQ(books.size(), 2U);  // the program's, and the daemon's own
+  for (const Dictionary& row : books) {
+    const int all = row.integer("queued") + row.integer("batched") + row.integer("inFlight") +
+                    row.integer("waiting") + row.integer("outbox") + row.integer("delivered") +
+                    row.integer("dropped");
+    EXPECT_EQ(row.integer("taken"), all);
+  }
+  EXPECT_NE(columns({"books"}).find("(start and stop)"), std::string::npos);
+
+  const std::vector<Dictionary> bags = rows(json({"storebags"}), "storebags");
+  ASSERT_EQ(bags.size(), 1U);
+  EXPECT_EQ(text(bags[0], "state"), "good");
+  EXPECT_NE(columns({"storebags"}).find("cadmor  1 "), std::string::npos) << columns({"storebags"});
+
+  EXPECT_EQ(text(json({"log-level", "error"}), "logLevel"), "error");
+  EXPECT_EQ(columns({"log-level"}), "error\n");
+  EXPECT_EQ(text(json({"metrics"}), "openmetrics").substr(0, 7), "# HELP ");
+}
+
+TEST_F(KytctlWindow, TellsWhatIsLostAndWhichRuleKeepsABackEndOff) {
+  lay();
+  putBag("cadmor", {entry("a"), entry("broken", "/no-such-path")});
+  startDaemon();
+  TestClient unlisted(socket(), 7, "unlisted");
+  EXPECT_EQ(unlisted.configure(), "live:");
+  EXPECT_TRUE(unlisted.send(5, 1, {}));
+  EXPECT_EQ(unlisted.displayURL(), "https://display.example.org/");
+  TestClient broken(socket(), 7, "broken");
+  EXPECT_EQ(broken.configure(), "live: httppost");
+  EXPECT_TRUE(broken.send(5, 1, {}));
+  EXPECT_EQ(broken.flush(), "flushed");
+  const std::string shown = columns({"status"});
+  EXPECT_NE(shown.find("QH httppost disabled by client, in 1 sessions"), std::string::npos) << shown;
+  EXPECT_NE(shown.find(" 1 event-dropped-by-state\n"), std::string::npos) << shown;
+  EXPECT_NE(shown.find(" 1 post-refused\n"), std::string::npos) << shown;
+  EXPECT_NE(shown.find("last error at "), std::string::npos) << shown;
+  EXPECT_NE(shown.find(": status 404\n"), std::string::npos) << shown;
+}
+
+TEST_F(KytctlWindow, IsNotConfusedByNamesOfAnyKind) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  const std::string garbage = "\x1b[2J\"},{\\\n# EOF\n\t\xff\xfe\u202e{}=\"1\" " + std::string(300, 'w');
+  TestClient client(socket(), 7, garbage);
+  EXPECT_EQ(client.configure(), "live:");
+  EXPECT_TRUE(client.send(5, 1, {}));
+  EXPECT_EQ(client.displayURL(), "https://display.example.org/");
+  for (const char* command : {"status", "sessions", "books", "storebags"}) {
+    static_cast<void>(columns({command}));
+    static_cast<void>(json({command}));
+  }
+  const std::string metrics = text(json({"metrics"}), "openmetrics");
+  EXPECT_EQ(metrics.find("# EOF\n"), metrics.size() - 6);
+}
+
+// A strict reader of the format: the text's families in order, each with its type before its samples, no sample twice.
+TEST_F(KytctlWindow, PrintsMetricsInTheOpenMetricsFormat) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  TestClient client(socket(), 7, "a \"quoted\" \\ name\n");
+  EXPECT_EQ(client.configure(), "live:");
+  EXPECT_TRUE(client.send(5, 1, {}));
+  EXPECT_EQ(client.displayURL(), "https://display.example.org/");
+  const ProgramRun run = kytctl({"metrics"});
+  ASSERT_EQ(run.status, 0) << run.text;
+  const std::vector<std::string> lines = linesOf(run.text);
+  ASSERT_FALSE(lines.empty());
+  EXPECT_EQ(lines.back(), "# EOF");
+  const std::regex help("# HELP ([a-z_]+) [^\\n]+\\."), type("# TYPE ([a-z_]+) (counter|gauge)"),
+      unit("# UNIT ([a-z_]+) ([a-z]+)"),
+      sample(
+          R"(([a-z_]+)(\{[a-z_]+="(?:[^"\\]|\\[\\"n])*"(?:,[a-z_]+="(?:[^"\\]|\\[\\"n])*")*\})? ([0-9]+))");
+  std::set<std::string> families, samples;
+  std::string family, kind;
+  std::map<std::string, std::string> values;
+  for (size_t i = 0; i + 1 < lines.size(); ++i) {
+    std::smatch found;
+    if (std::regex_match(lines[i], found, help)) {
+      family = found[1];
+      kind.clear();
+      EXPECT_TRUE(families.insert(family).second) << "twice: " << family;
+    } else if (std::regex_match(lines[i], found, type)) {
+      EXPECT_EQ(found[1], family);
+      kind = found[2];
+    } else if (std::regex_match(lines[i], found, unit)) {
+      EXPECT_EQ(found[1], family);
+      EXPECT_TRUE(family.ends_with("_" + found[2].str())) << family;
+    } else {
+      ASSERT_TRUE(std::regex_match(lines[i], found, sample)) << lines[i];
+      EXPECT_EQ(found[1], kind == "counter" ? family + "_total" : family) << lines[i];
+      EXPECT_TRUE(samples.insert(found[1].str() + found[2].str()).second) << "twice: " << lines[i];
+      values[found[1]] = found[3];
+    }
+  }
+  EXPECT_EQ(values["kytreportingd_sessions"], "1");
+  EXPECT_TRUE(values.count("kytreportingd_events_dropped_total")) << run.text;
+  EXPECT_NE(run.text.find(R"(client="a \"quoted\" \\ name\\n")"), std::string::npos) << run.text;
+}
+
+TEST_F(KytctlWindow, SaysThatTheDaemonDoesNotRunAndWhetherASocketWaits) {
+  DaemonProcess daemon("http://127.0.0.1:9");
+  const std::string program = std::string(KYT_PROGRAMS) + "/kytctl";
+  for (const char* command : {"status", "sessions", "books", "storebags", "metrics", "log-level"}) {
+    const ProgramRun run = runProgram(program, {"--root", daemon.root().path(), command});
+    EXPECT_EQ(run.status, 3) << command;
+    EXPECT_NE(run.text.find("kytctl: the daemon does not run, and no socket waits for clients at "),
+              std::string::npos)
+        << run.text;
+  }
+  daemon.activateBySocket();
+  const ProgramRun run = runProgram(program, {"--root", daemon.root().path(), "status", "--json"});
+  EXPECT_EQ(run.status, 3);
+  EXPECT_EQ(run.text, "kytctl: the daemon does not run; its socket waits for the first client\n");
+}
+
+}  // namespace
+}  // namespace kyt

@@ -1,0 +1,48 @@
+// The other end of the administration socket: asks the daemon how it stands. One call at a time, on the caller's thread,
+// which waits for the answer.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "platform/base/Descriptor.h"
+#include "platform/base/Error.h"
+#include "platform/ipc/BodyReader.h"
+#include "platform/ipc/MessageReader.h"
+#include "platform/objects/Value.h"
+
+namespace kyt::tools {
+
+class WindowClient {
+ public:
+  // Beneath the root. An error's code is kNoDaemon when nobody listens there; its text says whether a socket waits for the
+  // first client, which is looked up and not tried, since that would start the daemon.
+  static constexpr int32_t kNoDaemon = 3;
+  [[nodiscard]] static std::variant<WindowClient, Error> connect(const std::string& root);
+
+  [[nodiscard]] std::variant<Dictionary, Error> dictionary(std::string_view member);                 // a{sv}
+  [[nodiscard]] std::variant<std::vector<Dictionary>, Error> dictionaries(std::string_view member);  // aa{sv}
+  [[nodiscard]] std::variant<std::string, Error> text(std::string_view member);                      // s
+  // With one text as argument, without an answer but that it was done.
+  [[nodiscard]] std::optional<Error> tell(std::string_view member, std::string_view argument);
+
+ private:
+  explicit WindowClient(Descriptor socket) : socket_(std::move(socket)) {}
+  [[nodiscard]] std::optional<Error> shakeHands();
+  [[nodiscard]] std::optional<Error> send(std::string_view bytes) const;
+  [[nodiscard]] std::optional<Error> receive();
+  // The next message, which lies in received_ until the next call.
+  [[nodiscard]] std::variant<Message, Error> next();
+  [[nodiscard]] std::variant<Message, Error> call(std::string_view member,
+                                                  const std::optional<std::string_view>& argument);
+
+  Descriptor socket_;
+  std::string received_;
+  size_t used_ = 0;  // of it
+  uint32_t serial_ = 0;
+};
+
+}  // namespace kyt::tools
