@@ -32,7 +32,7 @@ class TryingIt : public ::testing::Test {
         KYT_PROGRAMS "/kytdemo",
         {"--programs", KYT_PROGRAMS, "--share", KYT_SHARE, "--folder", folder_ / "stage"}, how);
     ASSERT_TRUE(demonstration_);
-    ASSERT_TRUE(eventually([this] { return said("The page is at ") || !demonstration_->isRunning(); }));
+    ASSERT_TRUE(eventually([this] { return said("See them come in at ") || !demonstration_->isRunning(); }));
     ASSERT_TRUE(demonstration_->isRunning()) << folder_.read("output");
   }
   void TearDown() override {
