@@ -14,7 +14,8 @@ namespace {
 constexpr size_t kCorpus = 512;
 // What is told apart from its reference at most: consent off, as packaged.
 constexpr double kMostOfFloor = 1.35;
-constexpr double kMostOfFloorAtRest = 2.2;
+// Older goals, whose floor has zlib in it: random digits.
+constexpr double kMostOfZlib = 1.6, kMostOfZlibAtRest = 2.2;
 
 std::unique_ptr<Stand> standFor(const Surroundings& surroundings, bool consent, int batch, bool tls = false) {
   return Stand::make({surroundings.programs, surroundings.share, consent, tls, batch});
@@ -39,7 +40,21 @@ std::string figureOf(const Stand::Run& run, double floor) {
 }
 
 std::string floorText(const ReferenceFigures& reference) {
-  return text("own writer + %s: %.2f µs", reference.compressor.c_str(), reference.secondsPerRecord * 1e6);
+  return text("own writer + %s: %.2f µs, zlib: %.2f", reference.compressor.c_str(),
+              reference.secondsPerRecord * 1e6, reference.secondsWithZlib * 1e6);
+}
+
+struct Goal {
+  std::string text;
+  double most = 0;  // microseconds; 0: none
+};
+Goal goalOf(const Posting& posting, const ReferenceFigures& reference) {
+  if (posting.consent) return {};
+  if (posting.ordinary && posting.clients == 1)
+    return {text("at most %.2f×", kMostOfFloor), kMostOfFloor * reference.secondsPerRecord * 1e6};
+  if (!posting.ordinary && posting.clients == 4)
+    return {text("at most %.1f× zlib", kMostOfZlib), kMostOfZlib * reference.secondsWithZlib * 1e6};
+  return {};
 }
 
 std::string wholeText(const Stand::Run& run) {
@@ -58,10 +73,9 @@ void measurePosting(const Surroundings& surroundings) {
         stand->post(calls, {.clients = posting.clients, .each = surroundings.sizes.events / posting.clients});
     const ReferenceFigures reference = referenceOf(*stand, surroundings);
     const double floor = reference.secondsPerRecord * 1e6;
-    const bool goal = posting.ordinary && !posting.consent && posting.clients == 1;
-    printRow("processor time: " + posting.name(), figureOf(run, floor), floorText(reference),
-             goal ? text("at most %.2f×", kMostOfFloor) : "",
-             goal ? std::optional(run.whole && run.microseconds() / floor <= kMostOfFloor) : std::nullopt);
+    const Goal goal = goalOf(posting, reference);
+    printRow("processor time: " + posting.name(), figureOf(run, floor), floorText(reference), goal.text,
+             goal.most > 0 ? std::optional(run.whole && run.microseconds() <= goal.most) : std::nullopt);
     printRow(
         "rate, memory: " + posting.name(),
         text("%.0f /s, %.1f MiB at most", run.rate(), static_cast<double>(run.mostResident) / 1048576.0) +
@@ -99,11 +113,10 @@ void measureQuiet(const Surroundings& surroundings) {
         stand->post(calls, {.clients = posting.clients, .each = each, .perWrite = 1, .perSecond = 1250});
     const ReferenceFigures reference = referenceOf(*stand, surroundings);
     const double floor = reference.secondsPerRecord * 1e6;
-    const bool goal = !posting.ordinary;
-    printRow(
-        "5,000 a second: " + posting.name(), figureOf(run, floor) + wholeText(run), floorText(reference),
-        goal ? text("at most %.1f×", kMostOfFloorAtRest) : "",
-        goal ? std::optional(run.whole && run.microseconds() / floor <= kMostOfFloorAtRest) : std::nullopt);
+    const double most = posting.ordinary ? 0 : kMostOfZlibAtRest * reference.secondsWithZlib * 1e6;
+    printRow("5,000 a second: " + posting.name(), figureOf(run, floor) + wholeText(run), floorText(reference),
+             most > 0 ? text("at most %.1f× zlib", kMostOfZlibAtRest) : "",
+             most > 0 ? std::optional(run.whole && run.microseconds() <= most) : std::nullopt);
   }
 }
 

@@ -11,6 +11,7 @@ namespace kyt::bench {
 
 struct ReferenceFigures {
   double secondsPerRecord = 0;     // processor time
+  double secondsWithZlib = 0;      // of a record, with zlib's default level in its place
   std::string compressor;          // library and level
   double jsonBytesPerRecord = 0;   // before compression
   double bytesPerRecord = 0;       // of the bodies that arrived

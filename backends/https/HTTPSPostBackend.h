@@ -20,7 +20,6 @@
 #include <optional>
 #include <string>
 #include <utility>
-#include <variant>
 
 #include "backend/KYTReportingBackend.h"
 #include "backends/https/ClientRules.h"
@@ -130,7 +129,7 @@ class HTTPSPostBackend : public KYTReportingBackend {
   Value flush(FlushCompletion completion, TextOf text);
   // `bytes` are what the records count with the user.
   Value postBatch(EventBatch::Taken batch, uint64_t bytes, FlushCompletion completion, TextOf text);
-  void postBeside(std::variant<Array, PostRequest::Message> batch, BookedEvents events, uint64_t bytes);
+  void postBeside(PostRequest::Message message, BookedEvents events, uint64_t bytes);
   [[nodiscard]] bool takesRoomFor(uint64_t batched, uint64_t bytes);
   void giveBackToUser(uint64_t bytes) const;
   void tellDroppedByLimit() const;

@@ -166,10 +166,6 @@ Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, Flush
   const bool mayBeShown = post.mayBeShown();
   const bool mayGoBeside =
       !completion && text == TextOf::flush && bytes >= PostLine::kLeastBytes && decision_.postURL;
-  if (mayGoBeside && !mayBeShown) {
-    postBeside(std::move(batch.records), std::move(batch.events), bytes);
-    return {};
-  }
   PostRequest::Message message = makeMessage(post, std::move(batch.records));
   if (!blocking && message.json.size() >= kTakesLong) blocking.emplace();
   Value pretty;
@@ -192,26 +188,24 @@ Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, Flush
   return pretty;
 }
 
-// The records count with the user until the request does. The post's lines stand where it was decided on.
-void HTTPSPostBackend::postBeside(std::variant<Array, PostRequest::Message> batch, BookedEvents events,
-                                  uint64_t bytes) {
+// The records, of which the text alone is left, count with the user until the request does. The post's lines stand where it
+// was decided on.
+void HTTPSPostBackend::postBeside(PostRequest::Message message, BookedEvents events, uint64_t bytes) {
   std::optional<OutgoingPost> post =
       newPost(MessageFlag{0}, std::nullopt, std::nullopt, nullptr, std::move(events));
   if (!post) return giveBackToUser(bytes);
-  line_.add([post = std::move(*post), batch = std::move(batch), bytes, taken = LineOrder::later()]() mutable {
-    const LineOrder::SharedPlace place = std::move(taken);
-    const LineOrder::Scope lines(place);
-    const std::shared_ptr<UserAccount> account = post.reply.account;
-    const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
-    std::optional<BlockingScope> blocking;
-    if (bytes >= kTakesLong) blocking.emplace();
-    PostRequest::Message message = std::holds_alternative<Array>(batch)
-                                       ? post.post.message(std::get<Array>(std::move(batch)))
-                                       : std::get<PostRequest::Message>(std::move(batch));
-    if (account != nullptr) account->giveBack(Share::bytes, bytes);
-    if (message.events == 0) post.reply.events.dropped(Reason::postWithoutClientID);
-    std::move(post).send(std::move(message.json));
-  });
+  line_.add(
+      [post = std::move(*post), message = std::move(message), bytes, taken = LineOrder::later()]() mutable {
+        const LineOrder::SharedPlace place = std::move(taken);
+        const LineOrder::Scope lines(place);
+        const std::shared_ptr<UserAccount> account = post.reply.account;
+        const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
+        std::optional<BlockingScope> blocking;
+        if (bytes >= kTakesLong) blocking.emplace();
+        if (account != nullptr) account->giveBack(Share::bytes, bytes);
+        if (message.events == 0) post.reply.events.dropped(Reason::postWithoutClientID);
+        std::move(post).send(std::move(message.json));
+      });
 }
 
 bool HTTPSPostBackend::admits(const Dictionary& record) const {

@@ -1,6 +1,6 @@
-// What follows the decision to post a batch, for one back end: the message's text, its compression, the request. A large
-// batch is posted beside the session's queue, so that one busy program has two processors; the posts of a back end stay in
-// their order. Used by HTTPSPostBackend, on its session's queue.
+// What follows when the text of a batch is made, for one back end: its compression, the request. A large batch is posted
+// beside the session's queue, so that one busy program has two processors; the posts of a back end stay in their order. The
+// text is made before: records would take three times its room while they wait, and are freed best where they were made. Used by HTTPSPostBackend, on its session's queue.
 //
 // A post holds all that it needs and nothing of the back end. At most `kMostWaiting` wait; who comes with another first does
 // that work itself, or waits for it. Where many sessions are at work, all processors are, and each does its posts itself:

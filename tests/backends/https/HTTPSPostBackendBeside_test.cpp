@@ -50,7 +50,7 @@ TEST_F(HTTPSPostBackendBeside, ALargeBatchIsPostedByAnotherThread) {
   decided();
   EXPECT_TRUE(sendBatch().isNull());
   EXPECT_TRUE(poster_->requests.empty());
-  EXPECT_EQ(platform_.deflate.calls.streams, 0) << "not even its text is made";
+  EXPECT_EQ(platform_.deflate.calls.streams, 0) << "nothing is compressed yet";
   platform_.executor.runAll();
   ASSERT_EQ(poster_->requests.size(), 1u);
   ASSERT_EQ(events(0).size(), static_cast<size_t>(kEvents));
