@@ -79,12 +79,21 @@ void DepartureTable::add(const Departure& departure, double now) {
   Key key{hourOf(now), departure.program, cut(departure.server), departure.kind};
   key.program.clientName = cut(std::move(key.program.clientName));
   key.program.service = cut(std::move(key.program.service));
-  if (rows_.size() >= kMostRows && !rows_.contains(key)) {
+  const bool isFull = rows_.size() >= kMostRows;
+  if (!rows_.contains(key) && (isFull || rowsOf(key.program.user) >= kMostRowsOfUser)) {
+    const uint32_t user = isFull ? kManyUsers : key.program.user;
     key.program = ReportingProgram();
+    key.program.user = user;
     key.program.clientType = kManyPrograms;
     key.server.clear();
   }
   addTo(rows_[key], {1, departure.events, departure.bytes, departure.isAnswered ? 0U : 1U, now});
+}
+
+size_t DepartureTable::rowsOf(uint32_t user) const {
+  return static_cast<size_t>(std::count_if(rows_.begin(), rows_.end(), [user](const auto& row) {
+    return row.first.program.user == user && row.first.program.clientType != kManyPrograms;
+  }));
 }
 
 void DepartureTable::dropOld(double now) {

@@ -1,5 +1,6 @@
 // What left in the last day, added up by hour, program, server and kind: at most kMostRows rows, so whoever makes up names
-// makes no more of them. What finds no room is added up for each hour under no name. Has a form as an object, for a file.
+// makes no more of them, and no user takes more than a part. What finds no room is added up for each hour under no name, of
+// its user where he has used up his part. Has a form as an object, for a file.
 //
 // One thread at a time.
 #pragma once
@@ -17,10 +18,12 @@ namespace kyt {
 
 class DepartureTable {
  public:
-  static constexpr size_t kMostRows = 2048;      // some 250 bytes each in a file: half a megabyte
-  static constexpr size_t kMostNameBytes = 256;  // of each name of a row
-  static constexpr int64_t kHours = 24;          // besides the one that runs
-  static constexpr int32_t kManyPrograms = -1;   // the client type of rows that stand for what found no room
+  static constexpr size_t kMostRows = 2048;       // some 250 bytes each in a file: half a megabyte
+  static constexpr size_t kMostRowsOfUser = 512;  // besides those of what found no room
+  static constexpr size_t kMostNameBytes = 256;   // of each name of a row
+  static constexpr int64_t kHours = 24;           // besides the one that runs
+  static constexpr int32_t kManyPrograms = -1;    // the client type of rows that stand for what found no room
+  static constexpr uint32_t kManyUsers = UINT32_MAX;  // the user of such rows, where they are of several
 
   struct Key {
     int64_t hour = 0;  // hours since 1970
@@ -50,6 +53,8 @@ class DepartureTable {
   [[nodiscard]] static DepartureTable of(const Value& object);
 
  private:
+  [[nodiscard]] size_t rowsOf(uint32_t user) const;
+
   double since_;
   std::map<Key, Sum> rows_;
 };

@@ -251,10 +251,13 @@ class Owner {
       const bool isMany = row.program.clientType == DepartureTable::kManyPrograms;
       const std::string what =
           row.kind == DepartureKind::events ? std::to_string(sum.events) : nameOf(row.kind);
-      std::printf("%s %s %4d %6" PRIu32 " %s %8s %6" PRIu64 " %5s\n",
+      const bool isOfMany = row.program.user == DepartureTable::kManyUsers;
+      std::printf("%s %s %4s %6s %s %8s %6" PRIu64 " %5s\n",
                   fitted(isMany ? "(further programs)" : row.program.clientName, 20).c_str(),
-                  fitted(row.program.service, 12).c_str(), row.program.clientType, row.program.user,
-                  fitted(row.server, 28).c_str(), what.c_str(), sum.posts, sizeText(sum.bytes).c_str());
+                  fitted(row.program.service, 12).c_str(),
+                  isMany ? "-" : std::to_string(row.program.clientType).c_str(),
+                  isOfMany ? "-" : std::to_string(row.program.user).c_str(), fitted(row.server, 28).c_str(),
+                  what.c_str(), sum.posts, sizeText(sum.bytes).c_str());
       posts += sum.posts;
       unanswered += sum.unanswered;
     }

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <string>
 
 namespace kyt {
@@ -56,18 +57,35 @@ TEST(DepartureTable, ForgetsWhatIsOlderThanADay) {
 
 TEST(DepartureTable, DoesNotGrowWithTheNamesThatProgramsMakeUp) {
   DepartureTable table;
-  for (size_t i = 0; i < DepartureTable::kMostRows + 1000; ++i)
-    table.add(departure(std::to_string(i) + std::string(10000, 'x'), 1), kNow);
-  EXPECT_EQ(table.rows().size(), DepartureTable::kMostRows + 1);
+  constexpr uint32_t kUsers = 6;
+  constexpr size_t kEach = DepartureTable::kMostRowsOfUser + 100;
+  for (uint32_t user = 0; user < kUsers; ++user)
+    for (size_t i = 0; i < kEach; ++i) {
+      Departure made = departure(std::to_string(i) + std::string(10000, 'x'), 1);
+      made.program.user = user;
+      table.add(made, kNow);
+    }
+  std::map<uint32_t, uint64_t> further;
   uint64_t events = 0;
   for (const auto& [key, sum] : table.rows()) {
     events += sum.events;
     EXPECT_LE(key.program.clientName.size(), DepartureTable::kMostNameBytes);
-    if (key.program.clientType == DepartureTable::kManyPrograms) {
-      EXPECT_EQ(sum.events, 1000U);
-    }
+    if (key.program.clientType == DepartureTable::kManyPrograms) further[key.program.user] = sum.events;
   }
-  EXPECT_EQ(events, DepartureTable::kMostRows + 1000) << "none is left out";
+  EXPECT_LE(table.rows().size(), DepartureTable::kMostRows + 1);
+  EXPECT_EQ(events, kUsers * kEach) << "none is left out";
+  EXPECT_EQ(further[0], 100U) << "what one user makes up is his own";
+  EXPECT_GT(further[DepartureTable::kManyUsers], 0U);
+}
+
+TEST(DepartureTable, KeepsAnotherUsersProgramsApartWhereOneMakesUpNames) {
+  DepartureTable table;
+  for (size_t i = 0; i < 10 * DepartureTable::kMostRows; ++i) table.add(departure(std::to_string(i)), kNow);
+  Departure other = departure("other");
+  other.program.user = 1001;
+  table.add(other, kNow);
+  const DepartureTable::Key key{500000, other.program, other.server, DepartureKind::events};
+  EXPECT_TRUE(table.rows().contains(key));
 }
 
 TEST(DepartureTable, CutsNoCharacterInTwo) {
