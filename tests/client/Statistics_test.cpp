@@ -106,7 +106,8 @@ class RandomRun {
     if (what <= 88) return void(client.session->finish(milliseconds(number(0, 20))));
     if (what <= 92) return end(client);
     if (what <= 96) return checkAtRest(client);
-    for (int turns = number(1, 2000); turns > 0; --turns) std::this_thread::yield();
+    // Few: on a busy machine each lasts as long as everybody else's turn.
+    for (int turns = number(1, 10); turns > 0; --turns) std::this_thread::yield();
   }
 
   void toggleDaemon() {
@@ -249,7 +250,7 @@ class RandomRun {
 };
 
 TEST(StatisticsOfRandomSessions, CloseWhateverHappens) {
-  const unsigned runs = numberFrom("KYT_STATISTICS_RUNS", 40);
+  const unsigned runs = numberFrom("KYT_STATISTICS_RUNS", 25);
   const unsigned first = numberFrom("KYT_STATISTICS_SEED", std::random_device()());
   RecordProperty("first seed", std::to_string(first));
   for (unsigned i = 0; i < runs; ++i) {
