@@ -36,7 +36,8 @@ class HeldBack {
   ~HeldBack() = default;
 };
 
-// Stands where a thread waits. Made before the wait begins, with no lock held that others need for their work.
+// Stands where a thread waits. Made before the wait begins, with no lock held that others need for their work, but for the
+// gate (Gate.h) or monitor that is there for such waits: it is made behind it, so that who stands in line is told as that.
 class BlockingScope {
  public:
   explicit BlockingScope(BlockingKind kind = BlockingKind::other);

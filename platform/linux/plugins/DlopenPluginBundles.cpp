@@ -172,13 +172,18 @@ std::shared_ptr<PluginBundle> DlopenPluginBundles::bundleWithPath(std::string_vi
   std::string name = folder.substr(folder.rfind('/') + 1);
   name = name.substr(0, name.rfind('.'));
   const std::string file = folder + "/" + name + ".so";
+  {
+    MutexLock lock(mutex_);
+    const auto known = bundles_.find(file);
+    if (known != bundles_.end()) return known->second;
+  }
+  {
+    const BlockingScope blocking;
+    if (::access(file.c_str(), F_OK) != 0) return nullptr;
+  }
+  auto bundle = std::make_shared<LoadableBundle>(file, log_);
   MutexLock lock(mutex_);
-  const auto known = bundles_.find(file);
-  if (known != bundles_.end()) return known->second;
-  if (::access(file.c_str(), F_OK) != 0) return nullptr;
-  const auto bundle = std::make_shared<LoadableBundle>(file, log_);
-  bundles_.emplace(file, bundle);
-  return bundle;
+  return bundles_.emplace(file, std::move(bundle)).first->second;  // the first of several that looked for it
 }
 
 }  // namespace kyt

@@ -107,29 +107,33 @@ TEST_F(PluginTest, CallsAnObjectsOperationByItsName) {
   EXPECT_EQ(kept.objects, 0);
 }
 
-TEST_F(PluginTest, LoadingAndEachCallAreAnnouncedAsWaits) {
+TEST_F(PluginTest, LookingForItLoadingAndEachCallAreAnnouncedAsWaits) {
   struct Observer final : BlockingObserver {
     void willBlock(BlockingKind) override { ++waits; }
     void hasBlocked() override { ++ends; }
     int waits = 0, ends = 0;
   } observer;
   install();
-  const auto bundle = bundles_.bundleWithPath(kBundle);
   BlockingObserver* const former = BlockingObserver::exchange(&observer);
-  EXPECT_TRUE(bundle->load());
+  const auto bundle = bundles_.bundleWithPath(kBundle);
+  ASSERT_NE(bundle, nullptr);
   EXPECT_EQ(observer.waits, 1);
+  EXPECT_EQ(bundles_.bundleWithPath(kBundle), bundle);
+  EXPECT_EQ(observer.waits, 1) << "it is known";
   EXPECT_TRUE(bundle->load());
-  EXPECT_EQ(observer.waits, 1) << "it is loaded";
+  EXPECT_EQ(observer.waits, 2);
+  EXPECT_TRUE(bundle->load());
+  EXPECT_EQ(observer.waits, 2) << "it is loaded";
   const auto adaptor = bundle->classNamed("QDXAdaptor");
   auto object = adaptor->newInstance();
-  EXPECT_EQ(observer.waits, 2);
-  object->invoke(kOperation, 1, 2, {});
   EXPECT_EQ(observer.waits, 3);
-  EXPECT_EQ(object->description(), "the test's adaptor");
+  object->invoke(kOperation, 1, 2, {});
   EXPECT_EQ(observer.waits, 4);
-  object.reset();
+  EXPECT_EQ(object->description(), "the test's adaptor");
   EXPECT_EQ(observer.waits, 5);
-  EXPECT_EQ(observer.ends, 5);
+  object.reset();
+  EXPECT_EQ(observer.waits, 6);
+  EXPECT_EQ(observer.ends, 6);
   BlockingObserver::exchange(former);
 }
 
