@@ -31,6 +31,9 @@ class Administration::Window final : public AdministrationInterface {
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) override {
     return all_.setLogLevel(level);
   }
+  [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) override {
+    return all_.reload(lines);
+  }
 
  private:
   const Administration& all_;

@@ -43,6 +43,7 @@ struct AdministrationSources {
   std::function<ProcessFigures()> process;
   // The program that a process runs, empty where that cannot be known; may take seconds once, when nobody answers.
   std::function<std::string(int32_t)> programOf;
+  std::function<std::optional<std::string>(std::vector<std::string>&)> reload;  // see AdministrationInterface
 };
 
 // Who may look, besides root.
@@ -67,6 +68,9 @@ class Administration final : public ListenerDelegate {
   [[nodiscard]] std::vector<Dictionary> storebags() const;
   [[nodiscard]] std::string metrics() const;
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
+  [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) const {
+    return sources_.reload(lines);
+  }
 
  private:
   class Window;

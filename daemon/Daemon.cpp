@@ -7,7 +7,6 @@
 #include <utility>
 #include <variant>
 
-#include "daemon/DaemonReload.h"
 #include "daemon/DaemonServices.h"
 #include "platform/base/Paths.h"
 #include "platform/base/Settings.h"
@@ -122,11 +121,11 @@ std::chrono::seconds lastMoment(const Limits& limits) {
   return kForTheRest + std::chrono::seconds(static_cast<int64_t>(std::ceil(limits.shutdownGraceSeconds)));
 }
 
-int waitForTheEnd(StopSignals& signals, DaemonReload& reload) {
+int waitForTheEnd(StopSignals& signals, DaemonServices& services) {
   for (;;) {
     const int signal = signals.wait();
     if (signal != SIGHUP) return signal;
-    static_cast<void>(reload.reload());
+    services.reload();
   }
 }
 
@@ -202,15 +201,14 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
                            .messageLogs = paths.messageLogs(),
                            .acceptor = std::move(acceptor),
                            .window = std::move(window),
+                           .reload = {settings, configured.settingsFile, configured.logLevel},
                            .socketActivated = activated,
                            .idle = [&stopSignals] { stopSignals.request(); }});
-  DaemonReload reload({configured.settingsFile, settings, log, configured.logLevel,
-                       [&services](const Settings& changed) { services.takeUp(changed); }});
   services.resume();
   log.normal("main: Listener resumes with sandbox, start loop.");
   ServiceManager::ready("Listening");
   static_cast<void>(giveBackCodePages());
-  const int signal = waitForTheEnd(stopSignals, reload);
+  const int signal = waitForTheEnd(stopSignals, services);
   endProcessAtTheLatest(lastMoment(settings.limits), reserve.isUsed() ? kOutOfMemory : 0);
   if (reserve.isUsed())
     log.error("main: Ending, the system refuses memory");

@@ -16,14 +16,15 @@ bool DaemonReload::mustWait(const std::string& setting, const Settings& read) co
   return problem != nullptr && problem->error != 0;
 }
 
-std::vector<std::string> DaemonReload::reload() {
+DaemonReload::Outcome DaemonReload::reload() {
   const MutexLock lock(mutex_);
-  std::vector<std::string> lines;
+  Outcome outcome;
+  std::vector<std::string>& lines = outcome.lines;
   const auto read = readSettings(parts_.file);
   if (const auto* error = std::get_if<TomlError>(&read)) {
-    lines.push_back(error->text + ": nothing is taken up");
-    parts_.log.error("reload: %s", lines.back().c_str());
-    return lines;
+    outcome.problem = error->text + ": nothing is taken up";
+    parts_.log.error("reload: %s", outcome.problem->c_str());
+    return outcome;
   }
   const Settings& settings = std::get<Settings>(read);
   bool takesUp = false;
@@ -43,7 +44,7 @@ std::vector<std::string> DaemonReload::reload() {
   }
   if (lines.empty()) lines.emplace_back("no setting has changed");
   for (const std::string& line : lines) parts_.log.normal("reload: %s", line.c_str());
-  return lines;
+  return outcome;
 }
 
 }  // namespace kyt

@@ -25,13 +25,17 @@ class DaemonReload {
     std::optional<LogLevel> commandLine;  // then the file's level counts for nothing
     std::function<void(const Settings&)> takeUp;
   };
+  // A line for each setting that differs, or one that nothing has changed; with a problem there is none.
+  struct Outcome {
+    std::vector<std::string> lines;
+    std::optional<std::string> problem;  // "FILE:LINE: what is wrong: nothing is taken up"
+  };
   explicit DaemonReload(Parts parts) : parts_(std::move(parts)) {}
   DaemonReload(const DaemonReload&) = delete;
   DaemonReload& operator=(const DaemonReload&) = delete;
 
-  // A line for each setting that differs: "NAME: taken up" or "NAME: counts after a restart"; one that nothing has changed,
-  // or what is wrong with the file. They stand in the log too.
-  std::vector<std::string> reload() EXCLUDES(mutex_);
+  // "NAME: taken up", "NAME: counts after a restart". All of it stands in the log too.
+  Outcome reload() EXCLUDES(mutex_);
 
  private:
   [[nodiscard]] bool mustWait(const std::string& setting, const Settings& read) const;

@@ -61,6 +61,8 @@ DaemonServices::DaemonServices(Start start)
       counters_(start.system.counters),
       idle_(std::move(start.idle)),
       system_(std::move(start.system)),
+      reload_({std::move(start.reload.file), start.reload.running, log_, start.reload.commandLine,
+               [this](const Settings& changed) { system_.takeUp(changed); }}),
       deviceIdentity_(system_.ports),
       environment_(system_.ports, deviceIdentity_,
                    StorebagHosts{settings_.storebagInternalHost, settings_.storebagPublicHost}),
@@ -113,7 +115,13 @@ AdministrationSources DaemonServices::administrationSources(std::string version,
                 const OwnFigures own = ownFigures();
                 return ProcessFigures{own.pid, own.residentBytes, own.anonymousBytes, own.threads};
               },
-          .programOf = [&inspector](int32_t process) { return inspector.programPath(process); }};
+          .programOf = [&inspector](int32_t process) { return inspector.programPath(process); },
+          .reload =
+              [this](std::vector<std::string>& lines) {
+                DaemonReload::Outcome outcome = reload_.reload();
+                lines = std::move(outcome.lines);
+                return std::move(outcome.problem);
+              }};
 }
 
 DaemonServices::~DaemonServices() = default;

@@ -15,6 +15,7 @@
 #include "config/StorebagFetcher.h"
 #include "daemon/Administration.h"
 #include "daemon/DaemonPlatform.h"
+#include "daemon/DaemonReload.h"
 #include "daemon/ReportingdAgent.h"
 #include "platform/base/Mutex.h"
 #include "platform/ipc/DBusServer.h"
@@ -35,11 +36,18 @@ class DaemonServices {
     AdministrationAccess access;
     std::unique_ptr<StreamAcceptor> acceptor;  // null: there is no window
   };
+  // Where changed settings are read, and what they go into.
+  struct ReloadStart {
+    Settings& running;
+    std::string file;
+    std::optional<LogLevel> commandLine;
+  };
   struct Start {
     DaemonPlatform::Start system;
     std::string messageLogs;  // folder
     std::unique_ptr<StreamAcceptor> acceptor;
     WindowStart window;
+    ReloadStart reload;
     bool socketActivated = false;
     // The daemon has been idle for long enough and nothing is outstanding. Any thread.
     std::function<void()> idle;
@@ -51,8 +59,8 @@ class DaemonServices {
 
   // The listener takes connections from now on, and a service manager that asked for it is told that the daemon lives.
   void resume();
-  // See DaemonPlatform. Any thread.
-  void takeUp(const Settings& settings) { system_.takeUp(settings); }
+  // Takes up changed settings. Any thread.
+  void reload() { static_cast<void>(reload_.reload()); }
   // The orderly end: refuses new work, ends every session on its queue, waits for outstanding requests, all
   // under one deadline, and ends all threads. Once, on the main thread. False when threads would not end: then the
   // process must, without destroying this.
@@ -77,6 +85,7 @@ class DaemonServices {
   Counters& counters_;
   const std::function<void()> idle_;
   DaemonPlatform system_;
+  DaemonReload reload_;
 
   DeviceIdentity deviceIdentity_;
   Environment environment_;

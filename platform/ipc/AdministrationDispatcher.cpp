@@ -50,6 +50,15 @@ void setLogLevel(const Call& call, std::string_view /*signature*/) {
     call.reply.answerNothing();
 }
 
+void reload(const Call& call, std::string_view signature) {
+  if (call.in.finish() != BodyStatus::ok) return;
+  std::vector<std::string> lines;
+  if (const auto problem = call.window.reload(lines))
+    call.reply.error(wire::kErrorFailed, *problem);
+  else
+    call.reply.answer(signature, [&](MessageWriter& out) { out.writeStrings(lines); });
+}
+
 // Each at the place of its row in kAdministrationMethods.
 constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     status,
@@ -58,6 +67,7 @@ constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     dictionaries<&AdministrationInterface::storebags>,
     metrics,
     setLogLevel,
+    reload,
 };
 
 size_t numberOf(std::string_view member) {

@@ -24,6 +24,7 @@ inline constexpr std::array kAdministrationMethods{
     AdministrationContract{"Status", "", "a{sv}"}, AdministrationContract{"Sessions", "", "aa{sv}"},
     AdministrationContract{"Books", "", "aa{sv}"}, AdministrationContract{"Storebags", "", "aa{sv}"},
     AdministrationContract{"Metrics", "", "s"},    AdministrationContract{"SetLogLevel", "s", ""},
+    AdministrationContract{"Reload", "", "as"},
 };
 
 class AdministrationDispatcher final : public MessageDispatcher {

@@ -28,6 +28,9 @@ class AdministrationInterface : public ExportedObject {
   [[nodiscard]] virtual std::string metrics() = 0;
   // "debug", "default" or "error", until the daemon ends. What is wrong with it, or none.
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;
+  // Takes up changed settings: a line for each that differs, in `lines`. What is wrong with their file, when nothing was
+  // taken up; or none.
+  [[nodiscard]] virtual std::optional<std::string> reload(std::vector<std::string>& lines) = 0;
 };
 
 }  // namespace kyt

@@ -94,6 +94,20 @@ bool BodyReader::readDictionaries(std::vector<Dictionary>& out) {
   return true;
 }
 
+bool BodyReader::readStrings(std::vector<std::string>& out) {
+  const uint8_t* end = nullptr;
+  if (!good() || !wire::array<4>(cursor_, end)) return false;
+  std::vector<std::string> result;
+  std::string_view text;
+  while (cursor_.at < end) {
+    if (!readStringView(text)) return false;
+    result.emplace_back(text);
+  }
+  if (!wire::endOfArray(cursor_, end)) return false;
+  out = std::move(result);
+  return true;
+}
+
 bool BodyReader::readOptionalValue(Value& out) {
   const uint8_t* end = nullptr;
   if (!good() || !wire::array<1>(cursor_, end)) return false;

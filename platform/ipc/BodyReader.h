@@ -44,6 +44,7 @@ class BodyReader {
   bool readDictionary(Dictionary& out);                         // a{sv}
   bool readOptionalDictionary(std::optional<Dictionary>& out);  // aa{sv}, none or one
   bool readDictionaries(std::vector<Dictionary>& out);          // aa{sv}, of any length
+  bool readStrings(std::vector<std::string>& out);              // as, of any length
   bool readOptionalValue(Value& out);                           // av, none or one; null: none
   bool readArray(Array& out);                                   // av, of any length
   bool readOptionalStrings(std::optional<Array>& out);          // aas, none or one

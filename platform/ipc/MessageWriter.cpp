@@ -375,6 +375,12 @@ void MessageWriter::writeDictionaries(std::span<const Dictionary> dictionaries) 
   endArray(mark);
 }
 
+void MessageWriter::writeStrings(std::span<const std::string> strings) {
+  const ArrayMark mark = beginArray(4);
+  for (const std::string& string : strings) writeString(string);
+  endArray(mark);
+}
+
 void MessageWriter::writeOptionalValue(const Value& value) {
   const ArrayMark mark = beginArray(1);
   if (!value.isNull()) writeVariant(value, 1);

@@ -63,6 +63,7 @@ class MessageWriter {
   void writeEmptyDictionary();                                           // a{sv}
   void writeOptionalDictionary(const std::optional<Dictionary>& value);  // aa{sv}
   void writeDictionaries(std::span<const Dictionary> dictionaries);      // aa{sv}, of any length
+  void writeStrings(std::span<const std::string> strings);               // as
   void writeOptionalValue(const Value& value);                           // av; null: none
   void writeArray(const Array& array);                                   // av, of any length
   void writeOptionalStrings(const std::optional<Array>& strings);        // aas; what is no string is left out

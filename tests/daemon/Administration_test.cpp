@@ -40,7 +40,8 @@ class AdministrationTest : public AgentFixture {
                                       [] {
                                         return ProcessFigures{42, 9 << 20, 3 << 20, 6};
                                       },
-                                  .programOf = [](int32_t) { return std::string("/usr/bin/program"); }},
+                                  .programOf = [](int32_t) { return std::string("/usr/bin/program"); },
+                                  .reload = {}},
                                  {.user = 500, .group = 4, .groupName = "adm"}};
   FakeListener windows_;
 };

@@ -144,6 +144,24 @@ TEST_F(Reload, ChangesNothingWhenTheFileIsWrong) {
   EXPECT_TRUE(arrive("client=person&method=3", 1)) << "the limit of the wrong file does not count";
 }
 
+TEST_F(Reload, IsAskedForAndToldByKytctl) {
+  EXPECT_EQ(kytctl({"reload"}).status, 3) << "no daemon runs";
+  startDaemon();
+  EXPECT_EQ(kytctl({"reload"}).text, "no setting has changed\n");
+  write("[limits]\nmax_batch_bytes = 1000\n[service]\nidle_exit_seconds = 7\n");
+  const std::string told =
+      "limits.max_batch_bytes: taken up\nservice.idle_exit_seconds: counts after a restart\n";
+  EXPECT_EQ(kytctl({"reload"}).text, told);
+  EXPECT_EQ(kytctl({"reload", "--json"}).text,
+            "{\"settings\":[\"service.idle_exit_seconds: counts after a restart\"]}\n");
+  write("[limits]\nmax_batch_byte = 1\n");
+  const ProgramRun wrong = kytctl({"reload"});
+  EXPECT_EQ(wrong.status, 1);
+  EXPECT_NE(wrong.text.find("; the nearest known one is \"limits.max_batch_bytes\": nothing is taken up\n"),
+            std::string::npos)
+      << wrong.text;
+}
+
 TEST_F(Reload, LeavesTheCommandLinesLevel) {
   stage_ = nullptr;
   lay();  // with --log-level default

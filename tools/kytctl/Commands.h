@@ -106,6 +106,7 @@ struct SimulateOptions {
 [[nodiscard]] int metricsCommand(const std::string& root, bool json);
 // Prints the level, or sets it first.
 [[nodiscard]] int logLevelCommand(const std::string& root, const std::string& level, bool json);
+[[nodiscard]] int reloadCommand(const std::string& root, bool json);
 
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);

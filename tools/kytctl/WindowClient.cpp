@@ -176,6 +176,16 @@ std::variant<std::string, Error> WindowClient::text(std::string_view member) {
   return std::string(result);
 }
 
+std::variant<std::vector<std::string>, Error> WindowClient::texts(std::string_view member) {
+  auto answer = call(member, std::nullopt);
+  if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
+  BodyReader in(std::get<Message>(answer));
+  std::vector<std::string> result;
+  if (in.hasSignature("as")) in.readStrings(result);
+  if (in.finish() != BodyStatus::ok) return failure("the daemon's answer is of another form");
+  return result;
+}
+
 std::optional<Error> WindowClient::tell(std::string_view member, std::string_view argument) {
   auto answer = call(member, argument);
   if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);

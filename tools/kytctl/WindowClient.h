@@ -26,6 +26,7 @@ class WindowClient {
   [[nodiscard]] std::variant<Dictionary, Error> dictionary(std::string_view member);                 // a{sv}
   [[nodiscard]] std::variant<std::vector<Dictionary>, Error> dictionaries(std::string_view member);  // aa{sv}
   [[nodiscard]] std::variant<std::string, Error> text(std::string_view member);                      // s
+  [[nodiscard]] std::variant<std::vector<std::string>, Error> texts(std::string_view member);        // as
   // With one text as argument, without an answer but that it was done.
   [[nodiscard]] std::optional<Error> tell(std::string_view member, std::string_view argument);
 

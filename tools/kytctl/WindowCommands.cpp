@@ -213,4 +213,18 @@ int logLevelCommand(const std::string& root, const std::string& level, bool json
   return 0;
 }
 
+int reloadCommand(const std::string& root, bool json) {
+  auto client = WindowClient::connect(root);
+  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  auto answer = std::get<WindowClient>(client).texts("Reload");
+  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
+  Array lines;
+  for (const std::string& line : std::get<std::vector<std::string>>(answer)) {
+    if (!json) std::printf("%s\n", escapedText(line).c_str());
+    lines.append(Value(line));
+  }
+  if (json) printJSON(Dictionary{{"settings", std::move(lines)}});
+  return 0;
+}
+
 }  // namespace kyt::tools

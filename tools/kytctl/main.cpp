@@ -227,7 +227,8 @@ void addWindow(CLI::App& app, Arguments& a) {
        sessionsCommand},
       {"books", "Print what became of each program's events", booksCommand},
       {"storebags", "Print which storebags are in force", storebagsCommand},
-      {"metrics", "Print the figures in the OpenMetrics text format", metricsCommand}};
+      {"metrics", "Print the figures in the OpenMetrics text format", metricsCommand},
+      {"reload", "Let the running daemon take up changed settings", reloadCommand}};
   for (const auto& [name, what, run] : commands) {
     CLI::App* command = app.add_subcommand(name, what);
     command->add_flag("--json", a.json, "Print one JSON object");

@@ -77,8 +77,9 @@ complete -c kytctl -n __kytctl_at -a books -d 'What became of events'
 complete -c kytctl -n __kytctl_at -a storebags -d 'Which storebags are in force'
 complete -c kytctl -n __kytctl_at -a metrics -d 'Figures in the OpenMetrics text format'
 complete -c kytctl -n __kytctl_at -a log-level -d 'What the running daemon logs'
+complete -c kytctl -n __kytctl_at -a reload -d 'Let the running daemon take up settings'
 complete -c kytctl -n '__kytctl_at log-level' -a 'debug default error'
-for command in status sessions books storebags metrics log-level
+for command in status sessions books storebags metrics log-level reload
     complete -c kytctl -n "__kytctl_at -b $command" -l json -d 'Print JSON'
 end
 complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'
