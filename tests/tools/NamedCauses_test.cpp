@@ -1,7 +1,7 @@
 // Mistakes that keep an event from arriving, or from arriving as it was meant, and who names the cause: mostly `kytctl
-// explain`, which needs neither a daemon nor its log; otherwise the library or the command that the mistake is made with. The
-// table "Mistakes, and who names them" of the programmers' guide is made of these rows: the last test compares the two and
-// prints what the guide should have.
+// explain`, which needs neither a daemon nor its log; `kytctl status` for what servers answered; otherwise the library or
+// the command that the mistake is made with. The table "Mistakes, and who names them" of the programmers' guide is made of
+// these rows: the last test compares the two and prints what the guide should have.
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -76,10 +76,14 @@ class Place : public StageTest {
                    "--user-info", R"({"ClientName":"person"})"})
         .status;
   }
-  // The daemon's log, once it says so.
-  [[nodiscard]] std::string logUntil(const std::string& text) const {
-    static_cast<void>(eventually([&] { return logged(text); }));
-    return daemonLog();
+  // Once it says so.
+  [[nodiscard]] std::string statusUntil(const std::string& text) const {
+    std::string told;
+    static_cast<void>(eventually([&] {
+      told = kytctl({"status"}).text;
+      return told.find(text) != std::string::npos;
+    }));
+    return told;
   }
 
  private:
@@ -98,6 +102,7 @@ struct Mistake {
 };
 
 const char* const kExplain = "`kytctl explain`";
+const char* const kStatus = "`kytctl status`";
 
 std::string childsReason(Place& place) {
   place.prepare();
@@ -239,28 +244,32 @@ std::vector<Mistake> mistakes() {
         place.prepare({{"expedite", 0}});
         return place.explain({"--single"});
       });
-  add("ServerRefuses", "the server answers 404", "the daemon's log",
-      "answered with status 404, 1 events of backend httppost are lost", [](Place& place) {
-        place.prepare();
-        place.startDaemonNow();
-        place.answerEventsWith(404);
-        EXPECT_EQ(place.sendAsPerson(), 0);
-        return place.logUntil("events of backend httppost are lost");
-      });
-  add("ServerFails", "the server answers 503", "the daemon's log",
-      "backend httppost disabled by server 503 return code", [](Place& place) {
-        place.prepare();
-        place.startDaemonNow();
-        place.answerEventsWith(503);
-        EXPECT_EQ(place.sendAsPerson(), 0);
-        return place.logUntil("disabled by server");
-      });
-  add("NobodyListens", "nobody listens at the `post_url`", "the daemon's log",
-      "HTTPSPostBackend(postJsonMessage): post error: ", [](Place& place) {
+  add("ServerRefuses", "the server answers 404", kStatus, ": 404 at ", [](Place& place) {
+    place.prepare();
+    place.startDaemonNow();
+    place.answerEventsWith(404);
+    EXPECT_EQ(place.sendAsPerson(), 0);
+    const std::string told = place.statusUntil(": 404 at ");
+    EXPECT_NE(told.find("post-refused"), std::string::npos) << told;
+    return told;
+  });
+  add("ServerFails", "the server answers 503", kStatus, ": 503 at ", [](Place& place) {
+    place.prepare();
+    place.startDaemonNow();
+    place.answerEventsWith(503);
+    EXPECT_EQ(place.sendAsPerson(), 0);
+    const std::string told = place.statusUntil(": 503 at ");
+    EXPECT_NE(told.find("post-refused"), std::string::npos) << told;
+    return told;
+  });
+  add("NobodyListens", "nobody listens at the `post_url`", kStatus, "https://127.0.0.1:1: never answered",
+      [](Place& place) {
         place.prepare({{"post_url", "https://127.0.0.1:1/events"}});
         place.startDaemonNow();
         EXPECT_EQ(place.sendAsPerson(), 0);
-        return place.logUntil("post error: ");
+        const std::string told = place.statusUntil("post-failed");
+        EXPECT_NE(told.find("last error at "), std::string::npos) << told;
+        return told;
       });
   add("NoPostURL", "the entry has no `post_url`", kExplain, "post-url FAILS missing", kept({}, "post_url"));
   add("Nested", "an array, an object or a number that is not finite in the payload", kExplain,
