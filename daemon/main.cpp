@@ -6,21 +6,22 @@
 #include "platform/linux/cli/CommandLine.h"
 
 int main(int argc, char** argv) {
-  CLI::App app("Collects telemetry events from client processes and delivers them to reporting back ends",
-               "kytreportingd");
+  const kyt::CommandLine commandLine(
+      "kytreportingd",
+      "Collects telemetry events from client processes and delivers them to reporting back ends");
   kyt::DaemonOptions options;
   options.version = kyt::programVersion();
   std::string level;
   bool checkConfig = false;
-  kyt::addCommonOptions(app);
-  app.add_option("--root", options.root, "A folder that stands in front of every fixed path");
-  app.add_option("--config", options.config,
-                 "The settings, instead of /etc/kytreportingd/kytreportingd.toml");
-  app.add_option("--log-level", level,
-                 "From which level on lines are logged, instead of the settings' log.level")
-      ->check(CLI::IsMember({"debug", "default", "error"}));
-  app.add_flag("--check-config", checkConfig, "Say what is wrong with the configuration, and end");
-  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
+  commandLine.option("--root", options.root, "A folder that stands in front of every fixed path");
+  commandLine.option("--config", options.config,
+                     "The settings, instead of /etc/kytreportingd/kytreportingd.toml");
+  commandLine
+      .option("--log-level", level,
+              "From which level on lines are logged, instead of the settings' log.level")
+      .oneOf({"debug", "default", "error"});
+  commandLine.flag("--check-config", checkConfig, "Say what is wrong with the configuration, and end");
+  if (const auto status = commandLine.parse(argc, argv)) return *status;
   if (!level.empty())
     options.logLevel = level == "debug"   ? kyt::LogLevel::debug
                        : level == "error" ? kyt::LogLevel::error

@@ -50,38 +50,39 @@ bool isHost(const std::string& host) {
   });
 }
 
-void describe(CLI::App& app, Options& options, std::vector<std::string>& digestKeys) {
-  app.add_option("--state", options.state, "Folder of certificates and database; made when missing")
-      ->required();
-  app.add_option("--bags", options.bags, "Folder of signed storebags, NAME.plist");
-  app.add_option("--sign-key", options.signKey, "Private key (PEM) that signs unsigned bags, NAME.bag.toml");
-  app.add_option("--https-port", options.httpsPort, "Port for devices; 0: any free one")
-      ->capture_default_str();
-  app.add_option("--http-port", options.httpPort, "Port of the page and the queries; 0: any free one")
-      ->capture_default_str();
-  app.add_option("--udp-port", options.udpPort, "Port of the dashboard feed (UDP); 0: any free one");
-  app.add_option("--listen", options.listen, "Address to listen on")->capture_default_str();
-  app.add_option("--host", options.hosts, "A further name or address for the certificate (repeatable)")
-      ->allow_extra_args(false);
-  app.add_option("--ready-file", options.readyFile, "Written when the ports are open: their numbers as JSON");
-  app.add_flag("--http-events", options.httpEvents,
-               "Take event posts, log data and uploads on the plain port too");
-  app.add_option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control")->capture_default_str();
-  app.add_option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)")
-      ->allow_extra_args(false);
-  app.add_option("--max-body", options.maxBodyBytes, "Bytes of a post, log data or an upload as sent")
-      ->capture_default_str();
-  app.add_option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON or an uploaded file")
-      ->capture_default_str();
-  app.add_option("--request-timeout", options.requestTimeout, "Seconds for a request to be whole")
-      ->check(CLI::Range(1, 3600))
-      ->default_str("60");
-  app.add_option("--keep-posts", options.keepPosts, "Posts kept; the oldest go")->capture_default_str();
-  app.add_option("--keep-bytes", options.keepBytes, "Bytes of posts kept; the oldest go")
-      ->capture_default_str();
-  app.add_option("--max-connections", options.maxConnections, "Connections of each port")
-      ->check(CLI::Range(4, 60000))
-      ->capture_default_str();
+void describe(const CommandLine& commandLine, Options& options, int& requestSeconds,
+              std::vector<std::string>& digestKeys) {
+  commandLine.option("--state", options.state, "Folder of certificates and database; made when missing")
+      .required();
+  commandLine.option("--bags", options.bags, "Folder of signed storebags, NAME.plist");
+  commandLine.option("--sign-key", options.signKey,
+                     "Private key (PEM) that signs unsigned bags, NAME.bag.toml");
+  commandLine.option("--https-port", options.httpsPort, "Port for devices; 0: any free one").showsDefault();
+  commandLine.option("--http-port", options.httpPort, "Port of the page and the queries; 0: any free one")
+      .showsDefault();
+  commandLine.option("--udp-port", options.udpPort, "Port of the dashboard feed (UDP); 0: any free one");
+  commandLine.option("--listen", options.listen, "Address to listen on").showsDefault();
+  commandLine.option("--host", options.hosts, "A further name or address for the certificate (repeatable)")
+      .repeatable();
+  commandLine.option("--ready-file", options.readyFile,
+                     "Written when the ports are open: their numbers as JSON");
+  commandLine.flag("--http-events", options.httpEvents,
+                   "Take event posts, log data and uploads on the plain port too");
+  commandLine.option("--max-age", options.maxAge, "Seconds in a storebag's Cache-Control").showsDefault();
+  commandLine.option("--digest-key", digestKeys, "[CLIENT=]HEX: posts must be signed with it (repeatable)")
+      .repeatable();
+  commandLine.option("--max-body", options.maxBodyBytes, "Bytes of a post, log data or an upload as sent")
+      .showsDefault();
+  commandLine.option("--max-inflated", options.maxInflatedBytes, "Bytes of a post's JSON or an uploaded file")
+      .showsDefault();
+  commandLine.option("--request-timeout", requestSeconds, "Seconds for a request to be whole")
+      .between(1, 3600)
+      .showsDefault();
+  commandLine.option("--keep-posts", options.keepPosts, "Posts kept; the oldest go").showsDefault();
+  commandLine.option("--keep-bytes", options.keepBytes, "Bytes of posts kept; the oldest go").showsDefault();
+  commandLine.option("--max-connections", options.maxConnections, "Connections of each port")
+      .between(4, 60000)
+      .showsDefault();
 }
 
 // The folder's lock, held until the process ends, or -1 with the reason.
@@ -179,11 +180,13 @@ int main(int argc, char** argv) {
   using namespace kyt::devserver;
   Options options;
   std::vector<std::string> digestKeys;
-  CLI::App app("A back end for development and tests: storebags, event posts, and a page that shows them",
-               "kytdevserver");
-  kyt::addCommonOptions(app);
-  describe(app, options, digestKeys);
-  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
+  const kyt::CommandLine commandLine(
+      "kytdevserver",
+      "A back end for development and tests: storebags, event posts, and a page that shows them");
+  auto requestSeconds = static_cast<int>(options.requestTimeout.count());
+  describe(commandLine, options, requestSeconds, digestKeys);
+  if (const auto status = commandLine.parse(argc, argv)) return *status;
+  options.requestTimeout = std::chrono::seconds(requestSeconds);
   for (const std::string& text : digestKeys) {
     const auto key = digestKeyFrom(text);
     if (!key) return failUsage("--digest-key takes [CLIENT=]HEX");

@@ -147,24 +147,23 @@ int demonstrate(Stage& stage, bool once) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app("The daemon, the development server and real clients on this machine", "kytdemo");
-  addCommonOptions(app);
+  const CommandLine commandLine("kytdemo",
+                                "The daemon, the development server and real clients on this machine");
   Stage::Options options;
   options.programs = executableFolder();
   options.share = options.programs + "/../share";
   std::string daemonUser = "daemon", clientUser = "nobody";
   bool once = false;
-  app.add_option("--programs", options.programs, "Folder of the programs, instead of this one's own");
-  app.add_option(
+  commandLine.option("--programs", options.programs, "Folder of the programs, instead of this one's own");
+  commandLine.option(
       "--share", options.share,
       "Folder of kytreporting/ with the bundles and the profile, instead of ../share seen from this program");
-  app.add_option("--folder", options.folder, "Lay out here and keep it, instead of in a temporary folder");
-  app.add_option("--daemon-user", daemonUser, "Started by root: whom the daemon runs as")
-      ->capture_default_str();
-  app.add_option("--client-user", clientUser, "Started by root: whom its clients run as")
-      ->capture_default_str();
-  app.add_flag("--once", once, "End after the checks; status 0 only if every event arrived as it should");
-  if (const auto status = parseCommandLine(app, argc, argv)) return *status;
+  commandLine.option("--folder", options.folder,
+                     "Lay out here and keep it, instead of in a temporary folder");
+  commandLine.option("--daemon-user", daemonUser, "Started by root: whom the daemon runs as").showsDefault();
+  commandLine.option("--client-user", clientUser, "Started by root: whom its clients run as").showsDefault();
+  commandLine.flag("--once", once, "End after the checks; status 0 only if every event arrived as it should");
+  if (const auto status = commandLine.parse(argc, argv)) return *status;
   if (geteuid() == 0) {
     options.daemonUser = User::of(daemonUser);
     options.clientUser = User::of(clientUser);

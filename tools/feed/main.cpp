@@ -168,21 +168,22 @@ int main(int argc, char** argv) {
   using namespace kyt::tools;
   keepStandardStreams();
   Options options;
-  CLI::App app("Feeds events to a dashboard server and prints their local log lines", "kytfeed");
-  kyt::addCommonOptions(app);
-  app.add_option("--server", options.server, "The server's IPv4 address")->required();
-  app.add_option("--port", options.port, "Its UDP port")->required();
-  app.add_option("--reliable", options.reliable,
-                 "Reliable delivery: milliseconds between its ticks; less than 10 counts as 10");
-  app.add_flag("--without-profile", options.withoutProfile, "As a back end without one: reliable, 500 ms");
-  app.add_option("--session", options.session, "The session ID, 32 bits");
-  app.add_option("--client-type", options.clientType, "The client type, 0 to 23");
-  app.add_option("--client-version", options.clientVersion, "The client version, 16 bits");
-  app.add_option("--self-version", options.selfVersion, "The reporting side's version");
-  app.add_option("--device", options.device, "The device identifier; 40 characters are sent");
-  app.add_option("--interval", options.intervalMilliseconds, "Milliseconds between events");
-  app.add_option("events", options.file, "A file with one JSON object a line, or - for standard input");
-  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
+  const kyt::CommandLine commandLine("kytfeed",
+                                     "Feeds events to a dashboard server and prints their local log lines");
+  commandLine.option("--server", options.server, "The server's IPv4 address").required();
+  commandLine.option("--port", options.port, "Its UDP port").required();
+  commandLine.option("--reliable", options.reliable,
+                     "Reliable delivery: milliseconds between its ticks; less than 10 counts as 10");
+  commandLine.flag("--without-profile", options.withoutProfile,
+                   "As a back end without one: reliable, 500 ms");
+  commandLine.option("--session", options.session, "The session ID, 32 bits");
+  commandLine.option("--client-type", options.clientType, "The client type, 0 to 23");
+  commandLine.option("--client-version", options.clientVersion, "The client version, 16 bits");
+  commandLine.option("--self-version", options.selfVersion, "The reporting side's version");
+  commandLine.option("--device", options.device, "The device identifier; 40 characters are sent");
+  commandLine.option("--interval", options.intervalMilliseconds, "Milliseconds between events");
+  commandLine.option("events", options.file, "A file with one JSON object a line, or - for standard input");
+  if (const auto status = commandLine.parse(argc, argv)) return *status;
   if (options.file == "-") return feed(options, std::cin, [] { return std::ferror(stdin) != 0; });
   std::ifstream file(options.file);
   if (!file) return complain("can't read " + options.file + ": " + std::strerror(errno));

@@ -1,7 +1,12 @@
 // kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
 // consent, shows and erases what is known of the owner, makes keys, signs and checks storebags, and shows how the running
 // daemon stands.
+#include <cstdint>
+#include <limits>
+#include <optional>
+#include <string>
 #include <tuple>
+#include <utility>
 
 #include "platform/linux/cli/CommandLine.h"
 #include "tools/kytctl/Commands.h"
@@ -9,6 +14,9 @@
 namespace {
 
 using namespace kyt::tools;
+using kyt::Command;
+using kyt::CommandLine;
+using kyt::CommandOption;
 
 struct Arguments {
   ConnectionOptions connection;
@@ -57,171 +65,159 @@ constexpr char kSimulated[] =
 and "perDay" of a step "open" is how many such sessions a device has each day. What is not said is what the bag
 names, in equal shares, and one that it does not name; the consent is given then.)";
 
-void addConnectionOptions(CLI::App& command, Arguments& arguments) {
-  command.add_option("--socket", arguments.connection.socket,
-                     "The daemon's socket, instead of the fixed one");
-  command.add_option("--timeout", arguments.connection.timeoutSeconds, "Seconds to wait for the daemon")
-      ->check(CLI::Range(0.1, 3600.0));
+void addConnectionOptions(const Command& command, Arguments& arguments) {
+  command.option("--socket", arguments.connection.socket, "The daemon's socket, instead of the fixed one");
+  command.option("--timeout", arguments.connection.timeoutSeconds, "Seconds to wait for the daemon")
+      .between(0.1, 3600.0);
 }
 
-void addSend(CLI::App& app, Arguments& a) {
-  CLI::App* send = app.add_subcommand("send", "Send one event without a session of its own");
-  addConnectionOptions(*send, a);
-  send->add_option("--client-type", a.send.clientType, "The client type, 0 to 23")
-      ->required()
-      ->check(CLI::Range(0, 23));
-  send->add_option("--session-id", a.send.sessionID, "The session ID, 32 bits");
-  send->add_option("--client-version", a.send.clientVersion, "The client version, 16 bits");
-  send->add_option("--category", a.send.category, "The event's category (method)")->required();
-  send->add_option("--type", a.send.type, "The event's type (response code)")->required();
-  send->add_option("--payload", a.send.payloadJSON, "A JSON object");
-  send->add_option("--user-info", a.send.userInfoJSON,
-                   "A JSON object; ClientName and ServiceName choose the client entry");
-  send->add_flag("--require-user-info", a.send.requireUserInfo, "The session promises user information");
-  send->footer(kFinished);
-  send->callback([&a] { a.status = sendCommand(a.connection, a.send); });
+void addSend(const Command& program, Arguments& a) {
+  const Command send = program.command("send", "Send one event without a session of its own");
+  addConnectionOptions(send, a);
+  send.option("--client-type", a.send.clientType, "The client type, 0 to 23").required().between(0, 23);
+  send.option("--session-id", a.send.sessionID, "The session ID, 32 bits");
+  send.option("--client-version", a.send.clientVersion, "The client version, 16 bits");
+  send.option("--category", a.send.category, "The event's category (method)").required();
+  send.option("--type", a.send.type, "The event's type (response code)").required();
+  send.option("--payload", a.send.payloadJSON, "A JSON object");
+  send.option("--user-info", a.send.userInfoJSON,
+              "A JSON object; ClientName and ServiceName choose the client entry");
+  send.flag("--require-user-info", a.send.requireUserInfo, "The session promises user information");
+  send.ends(kFinished);
+  send.runs([&a] { a.status = sendCommand(a.connection, a.send); });
 
-  CLI::App* session =
-      app.add_subcommand("session", "Run a scripted session: one JSON object a line (kytctl session --help)");
-  addConnectionOptions(*session, a);
-  session->add_option("script", a.script, "A file, or - for standard input")->required();
-  session->footer(kSessionSteps);
-  session->callback([&a] { a.status = sessionCommand(a.connection, a.script); });
+  const Command session =
+      program.command("session", "Run a scripted session: one JSON object a line (kytctl session --help)");
+  addConnectionOptions(session, a);
+  session.option("script", a.script, "A file, or - for standard input").required();
+  session.ends(kSessionSteps);
+  session.runs([&a] { a.status = sessionCommand(a.connection, a.script); });
 }
 
-void addExplain(CLI::App& app, Arguments& a) {
-  CLI::App* explain = app.add_subcommand("explain", "Tell what becomes of an event on this device, and why");
+void addExplain(const Command& program, Arguments& a) {
+  const Command explain = program.command("explain", "Tell what becomes of an event on this device, and why");
   ExplainOptions& o = a.explain;
-  explain->add_option("event", o.event, "A JSON object, or - for standard input")->required();
-  CLI::Option* information = explain->add_option("--session-info", o.sessionInfoJSON,
-                                                 "The session's information, a JSON object, as it is sent");
-  for (CLI::Option* part :
-       {explain->add_option("--client-type", o.clientType, "The client type, 0 to 23"),
-        explain->add_option("--session-id", o.sessionID, "The session ID, 32 bits"),
-        explain->add_option("--client-version", o.clientVersion, "The client version, 16 bits"),
-        explain->add_flag("--require-user-info", o.requireUserInfo, "The session promises user information"),
-        explain->add_flag("--batch", o.batch, "The session batches its events")})
-    part->excludes(information);
-  CLI::Option* userInfo =
-      explain->add_option("--user-info", o.userInfoJSON, "The user information, a JSON object");
-  explain->add_option("--client", o.client, "The client's name in the user information")->excludes(userInfo);
-  explain->add_option("--service", o.service, "The service's name in the user information")
-      ->excludes(userInfo);
-  explain->add_flag("--single", o.single, "A single message, without a session");
-  explain->add_option("--storebag", o.storebag,
-                      "A document, or a bag not signed yet (.json, .toml, .plist), instead of the server's");
-  CLI::Option* pid = explain->add_option("--pid", o.program.pid, "The program, a process")
-                         ->check(CLI::Range(1, std::numeric_limits<int32_t>::max()));
-  explain->add_option("--user", o.program.user, "Any process of a user instead; your own without either")
-      ->excludes(pid);
-  explain->add_option("--draw", o.draw, "The session's sampling draw, 0 to 1; all are tried without")
-      ->check(CLI::Range(0.0, 1.0));
-  explain->add_flag("--json", o.json, "Print one JSON object");
-  explain->footer(kExplained);
-  explain->callback([&a] { a.status = explainCommand(a.connection.root, a.explain); });
+  explain.option("event", o.event, "A JSON object, or - for standard input").required();
+  const CommandOption information = explain.option("--session-info", o.sessionInfoJSON,
+                                                   "The session's information, a JSON object, as it is sent");
+  for (const CommandOption& part :
+       {explain.option("--client-type", o.clientType, "The client type, 0 to 23"),
+        explain.option("--session-id", o.sessionID, "The session ID, 32 bits"),
+        explain.option("--client-version", o.clientVersion, "The client version, 16 bits"),
+        explain.flag("--require-user-info", o.requireUserInfo, "The session promises user information"),
+        explain.flag("--batch", o.batch, "The session batches its events")})
+    part.excludes(information);
+  const CommandOption userInfo =
+      explain.option("--user-info", o.userInfoJSON, "The user information, a JSON object");
+  explain.option("--client", o.client, "The client's name in the user information").excludes(userInfo);
+  explain.option("--service", o.service, "The service's name in the user information").excludes(userInfo);
+  explain.flag("--single", o.single, "A single message, without a session");
+  explain.option("--storebag", o.storebag,
+                 "A document, or a bag not signed yet (.json, .toml, .plist), instead of the server's");
+  const CommandOption pid = explain.option("--pid", o.program.pid, "The program, a process")
+                                .between(1, std::numeric_limits<int32_t>::max());
+  explain.option("--user", o.program.user, "Any process of a user instead; your own without either")
+      .excludes(pid);
+  explain.option("--draw", o.draw, "The session's sampling draw, 0 to 1; all are tried without")
+      .between(0.0, 1.0);
+  explain.flag("--json", o.json, "Print one JSON object");
+  explain.ends(kExplained);
+  explain.runs([&a] { a.status = explainCommand(a.connection.root, a.explain); });
 }
 
-void addDefaults(CLI::App& app, Arguments& a) {
-  CLI::App* defaults = app.add_subcommand("defaults", "User defaults by domain and key");
-  defaults->require_subcommand(1);
-  CLI::App* read = defaults->add_subcommand("read", "Print a value, or all of a domain");
-  read->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
-  read->add_option("key", a.key, "The key; without one all are printed");
-  read->callback([&a] { a.status = defaultsReadCommand(a.connection.root, a.domain, a.key); });
-  CLI::App* write = defaults->add_subcommand("write", "Store a value");
-  write->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
-  write->add_option("key", a.key, "The key")->required();
-  write->add_option("value", a.value, "The value; put -- before one that begins with a minus sign")
-      ->required();
-  write->add_option("--type", a.type, "What the value is")
-      ->check(CLI::IsMember({"string", "integer", "real", "boolean"}))
-      ->capture_default_str();
-  write->callback(
-      [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, a.value); });
-  CLI::App* erase = defaults->add_subcommand("delete", "Remove a value");
-  erase->add_option("domain", a.domain, "The domain, as com.vantu.kytreporting")->required();
-  erase->add_option("key", a.key, "The key")->required();
-  erase->callback(
+void addDefaults(const Command& program, Arguments& a) {
+  const Command defaults = program.command("defaults", "User defaults by domain and key");
+  defaults.needsCommand();
+  const Command read = defaults.command("read", "Print a value, or all of a domain");
+  read.option("domain", a.domain, "The domain, as com.vantu.kytreporting").required();
+  read.option("key", a.key, "The key; without one all are printed");
+  read.runs([&a] { a.status = defaultsReadCommand(a.connection.root, a.domain, a.key); });
+  const Command write = defaults.command("write", "Store a value");
+  write.option("domain", a.domain, "The domain, as com.vantu.kytreporting").required();
+  write.option("key", a.key, "The key").required();
+  write.option("value", a.value, "The value; put -- before one that begins with a minus sign").required();
+  write.option("--type", a.type, "What the value is")
+      .oneOf({"string", "integer", "real", "boolean"})
+      .showsDefault();
+  write.runs([&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, a.value); });
+  const Command erase = defaults.command("delete", "Remove a value");
+  erase.option("domain", a.domain, "The domain, as com.vantu.kytreporting").required();
+  erase.option("key", a.key, "The key").required();
+  erase.runs(
       [&a] { a.status = defaultsWriteCommand(a.connection.root, a.domain, a.key, a.type, std::nullopt); });
 
-  CLI::App* consent = app.add_subcommand("consent", "The owner's consent to diagnostics-and-usage upload");
-  consent->require_subcommand(1);
+  const Command consent = program.command("consent", "The owner's consent to diagnostics-and-usage upload");
+  consent.needsCommand();
   const std::pair<const char*, const char*> changes[] = {
       {"show", "Print whether it is given"}, {"grant", "Give it"}, {"withdraw", "Take it back"}};
   for (const auto& [change, what] : changes)
-    consent->add_subcommand(change, what)->callback([&a, change = change] {
+    consent.command(change, what).runs([&a, change = change] {
       a.status = consentCommand(a.connection.root, change);
     });
 }
 
-void addOwner(CLI::App& app, Arguments& a) {
-  CLI::App* owner = app.add_subcommand("owner", "What left the device, for its owner");
-  owner->require_subcommand(1);
-  CLI::App* show =
-      owner->add_subcommand("show", "Print what left in the last day, identifiers, and what waits");
-  show->add_flag("--json", a.json, "As one JSON object");
-  show->callback([&a] { a.status = ownerShowCommand(a.connection.root, a.json); });
-  CLI::App* take =
-      owner->add_subcommand("export", "Write all that is kept about it on the device into a file");
-  take->add_option("file", a.document, "The file, JSON; - for standard output")->required();
-  take->callback([&a] { a.status = ownerExportCommand(a.connection.root, a.document); });
-  CLI::App* erase = owner->add_subcommand("erase", "Erase identifiers, local logs and what waits");
-  erase->callback([&a] { a.status = ownerEraseCommand(a.connection.root); });
+void addOwner(const Command& program, Arguments& a) {
+  const Command owner = program.command("owner", "What left the device, for its owner");
+  owner.needsCommand();
+  const Command show = owner.command("show", "Print what left in the last day, identifiers, and what waits");
+  show.flag("--json", a.json, "As one JSON object");
+  show.runs([&a] { a.status = ownerShowCommand(a.connection.root, a.json); });
+  const Command take = owner.command("export", "Write all that is kept about it on the device into a file");
+  take.option("file", a.document, "The file, JSON; - for standard output").required();
+  take.runs([&a] { a.status = ownerExportCommand(a.connection.root, a.document); });
+  const Command erase = owner.command("erase", "Erase identifiers, local logs and what waits");
+  erase.runs([&a] { a.status = ownerEraseCommand(a.connection.root); });
 }
 
-void addEntitlements(CLI::App& app, Arguments& a) {
-  CLI::App* entitlements = app.add_subcommand("entitlements", "Who may connect");
-  entitlements->require_subcommand(1);
-  CLI::App* check = entitlements->add_subcommand("check", "Tell why a client is served or refused");
-  CLI::Option* pid = check->add_option("--pid", a.check.pid, "A process")
-                         ->check(CLI::Range(1, std::numeric_limits<int32_t>::max()));
-  check->add_option("--user", a.check.user, "Any process of a user, by name or number")->excludes(pid);
-  check->callback([&a] { a.status = entitlementsCheckCommand(a.connection.root, a.check); });
+void addEntitlements(const Command& program, Arguments& a) {
+  const Command entitlements = program.command("entitlements", "Who may connect");
+  entitlements.needsCommand();
+  const Command check = entitlements.command("check", "Tell why a client is served or refused");
+  const CommandOption pid =
+      check.option("--pid", a.check.pid, "A process").between(1, std::numeric_limits<int32_t>::max());
+  check.option("--user", a.check.user, "Any process of a user, by name or number").excludes(pid);
+  check.runs([&a] { a.status = entitlementsCheckCommand(a.connection.root, a.check); });
 }
 
-void addStorebag(CLI::App& app, Arguments& a) {
-  CLI::App* keys = app.add_subcommand("keys", "Keys for signing storebags");
-  keys->require_subcommand(1);
-  CLI::App* make = keys->add_subcommand("make", "Write private.pem and publicKey.der into a folder");
-  make->add_option("folder", a.folder, "The folder; made when missing, its parent must exist")->required();
-  make->add_option("--bits", a.bits, "Length of the key, 2048 to 16384")->capture_default_str();
-  make->callback([&a] { a.status = makeKeysCommand(a.folder, a.bits); });
+void addStorebag(const Command& program, Arguments& a) {
+  const Command keys = program.command("keys", "Keys for signing storebags");
+  keys.needsCommand();
+  const Command make = keys.command("make", "Write private.pem and publicKey.der into a folder");
+  make.option("folder", a.folder, "The folder; made when missing, its parent must exist").required();
+  make.option("--bits", a.bits, "Length of the key, 2048 to 16384").showsDefault();
+  make.runs([&a] { a.status = makeKeysCommand(a.folder, a.bits); });
 
-  CLI::App* bag = app.add_subcommand("storebag", "Signed configurations");
-  bag->require_subcommand(1);
-  CLI::App* sign = bag->add_subcommand("sign", "Sign a bag into the document that servers hand out");
-  sign->add_option("bag", a.sign.bag, "FILE.json, FILE.toml or FILE.plist")->required();
-  sign->add_option("--key", a.sign.key, "The private key, PEM")->required();
-  sign->add_option("-o,--output", a.sign.output, "The document; - for standard output")->required();
-  sign->callback([&a] { a.status = signCommand(a.sign); });
-  CLI::App* verify = bag->add_subcommand("verify", "Check a document's signature");
-  verify->add_option("document", a.document, "The document; - for standard input")->required();
-  verify->add_option("--public-key", a.publicKey, "The public key, publicKey.der")->required();
-  verify->callback([&a] { a.status = verifyCommand(a.document, a.publicKey); });
-  CLI::App* show =
-      bag->add_subcommand("show", "Print the bag of a document as JSON, and what in it may surprise");
-  show->add_option("document", a.document, "The document; - for standard input")->required();
-  show->add_option("--public-key", a.publicKey, "Check the signature with this public key first");
-  show->callback([&a] { a.status = showCommand(a.document, a.publicKey); });
-  CLI::App* simulate =
-      bag->add_subcommand("simulate", "Tell how many sessions and events of many devices would leave");
-  simulate->add_option("bag", a.simulate.bag, "A document, or a bag (.json, .toml or .plist)")->required();
-  simulate
-      ->add_option("--events", a.simulate.events, "Sessions and events: steps as kytctl session takes them")
-      ->required();
-  simulate->add_option("--devices", a.simulate.devices, "How many devices")
-      ->check(CLI::Range(1, 1000000))
-      ->capture_default_str();
-  simulate->add_option("--seed", a.simulate.seed, "The same seed gives the same figures")
-      ->capture_default_str();
-  simulate->add_flag("--json", a.simulate.json, "Print one JSON object");
-  simulate->footer(kSimulated);
-  simulate->callback([&a] { a.status = simulateCommand(a.connection.root, a.simulate); });
+  const Command bag = program.command("storebag", "Signed configurations");
+  bag.needsCommand();
+  const Command sign = bag.command("sign", "Sign a bag into the document that servers hand out");
+  sign.option("bag", a.sign.bag, "FILE.json, FILE.toml or FILE.plist").required();
+  sign.option("--key", a.sign.key, "The private key, PEM").required();
+  sign.option("-o,--output", a.sign.output, "The document; - for standard output").required();
+  sign.runs([&a] { a.status = signCommand(a.sign); });
+  const Command verify = bag.command("verify", "Check a document's signature");
+  verify.option("document", a.document, "The document; - for standard input").required();
+  verify.option("--public-key", a.publicKey, "The public key, publicKey.der").required();
+  verify.runs([&a] { a.status = verifyCommand(a.document, a.publicKey); });
+  const Command show =
+      bag.command("show", "Print the bag of a document as JSON, and what in it may surprise");
+  show.option("document", a.document, "The document; - for standard input").required();
+  show.option("--public-key", a.publicKey, "Check the signature with this public key first");
+  show.runs([&a] { a.status = showCommand(a.document, a.publicKey); });
+  const Command simulate =
+      bag.command("simulate", "Tell how many sessions and events of many devices would leave");
+  simulate.option("bag", a.simulate.bag, "A document, or a bag (.json, .toml or .plist)").required();
+  simulate.option("--events", a.simulate.events, "Sessions and events: steps as kytctl session takes them")
+      .required();
+  simulate.option("--devices", a.simulate.devices, "How many devices").between(1, 1000000).showsDefault();
+  simulate.option("--seed", a.simulate.seed, "The same seed gives the same figures").showsDefault();
+  simulate.flag("--json", a.simulate.json, "Print one JSON object");
+  simulate.ends(kSimulated);
+  simulate.runs([&a] { a.status = simulateCommand(a.connection.root, a.simulate); });
 }
 
-void addWindow(CLI::App& app, Arguments& a) {
-  using Command = int (*)(const std::string&, bool);
-  const std::tuple<const char*, const char*, Command> commands[] = {
+void addWindow(const Command& program, Arguments& a) {
+  using Print = int (*)(const std::string&, bool);
+  const std::tuple<const char*, const char*, Print> commands[] = {
       {"status", "Print how the running daemon stands: what left, what is lost and why", statusCommand},
       {"sessions", "Print the sessions of the running daemon and the states of their back ends",
        sessionsCommand},
@@ -230,35 +226,33 @@ void addWindow(CLI::App& app, Arguments& a) {
       {"metrics", "Print the figures in the OpenMetrics text format", metricsCommand},
       {"reload", "Let the running daemon take up changed settings", reloadCommand}};
   for (const auto& [name, what, run] : commands) {
-    CLI::App* command = app.add_subcommand(name, what);
-    command->add_flag("--json", a.json, "Print one JSON object");
-    command->callback([&a, run = run] { a.status = run(a.connection.root, a.json); });
+    const Command command = program.command(name, what);
+    command.flag("--json", a.json, "Print one JSON object");
+    command.runs([&a, run = run] { a.status = run(a.connection.root, a.json); });
   }
-  CLI::App* level =
-      app.add_subcommand("log-level", "Print or set from which level on the running daemon logs lines");
-  level->add_option("level", a.level, "The new level, until the daemon ends")
-      ->check(CLI::IsMember({"debug", "default", "error"}));
-  level->add_flag("--json", a.json, "Print one JSON object");
-  level->callback([&a] { a.status = logLevelCommand(a.connection.root, a.level, a.json); });
+  const Command level =
+      program.command("log-level", "Print or set from which level on the running daemon logs lines");
+  level.option("level", a.level, "The new level, until the daemon ends").oneOf({"debug", "default", "error"});
+  level.flag("--json", a.json, "Print one JSON object");
+  level.runs([&a] { a.status = logLevelCommand(a.connection.root, a.level, a.json); });
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  CLI::App app("The command for people around kytreportingd", "kytctl");
-  kyt::addCommonOptions(app);
+  const CommandLine program("kytctl", "The command for people around kytreportingd");
   Arguments arguments;
-  app.add_option("--root", arguments.connection.root,
+  program.option("--root", arguments.connection.root,
                  "A folder that stands in front of every fixed path, as the daemon's --root");
-  app.require_subcommand(1);
-  app.fallthrough();
-  addSend(app, arguments);
-  addExplain(app, arguments);
-  addDefaults(app, arguments);
-  addOwner(app, arguments);
-  addEntitlements(app, arguments);
-  addStorebag(app, arguments);
-  addWindow(app, arguments);
-  if (const auto status = kyt::parseCommandLine(app, argc, argv)) return *status;
+  program.needsCommand();
+  program.takesOptionsAnywhere();
+  addSend(program, arguments);
+  addExplain(program, arguments);
+  addDefaults(program, arguments);
+  addOwner(program, arguments);
+  addEntitlements(program, arguments);
+  addStorebag(program, arguments);
+  addWindow(program, arguments);
+  if (const auto status = program.parse(argc, argv)) return *status;
   return arguments.status;
 }

@@ -1,7 +1,12 @@
 #include "platform/linux/cli/CommandLine.h"
 
+#include <CLI/CLI.hpp>
+#include <chrono>
+#include <cstdint>
 #include <cstdio>
+#include <filesystem>
 #include <string>
+#include <utility>
 
 #include "platform/base/TextEscape.h"
 
@@ -29,23 +34,102 @@ const char* programVersion() {
   return KYT_VERSION;
 }
 
-void addCommonOptions(CLI::App& app) {
-  app.set_help_flag("-h,--help", "Print this help and exit");
-  app.set_version_flag("--version", app.get_name() + " " KYT_VERSION, "Print the version and exit");
-  app.footer("The manual page " + app.get_name() + " tells more.");
+CommandOption CommandOption::required() const {
+  option_.required();
+  return *this;
 }
 
-std::optional<int> parseCommandLine(CLI::App& app, int argc, char** argv) {
+CommandOption CommandOption::showsDefault() const {
+  option_.capture_default_str();
+  return *this;
+}
+
+template <typename Number>
+CommandOption CommandOption::between(Number lowest, Number highest) const {
+  option_.check(CLI::Range(lowest, highest));
+  return *this;
+}
+template CommandOption CommandOption::between(int, int) const;
+template CommandOption CommandOption::between(double, double) const;
+
+CommandOption CommandOption::oneOf(std::vector<std::string> words) const {
+  option_.check(CLI::IsMember(std::move(words)));
+  return *this;
+}
+
+CommandOption CommandOption::excludes(CommandOption other) const {
+  option_.excludes(&other.option_);
+  return *this;
+}
+
+CommandOption CommandOption::repeatable() const {
+  option_.allow_extra_args(false);
+  return *this;
+}
+
+template <typename Target>
+CommandOption Command::option(const char* name, Target& target, const char* help) const {
+  return CommandOption(*app_.add_option(name, target, help));
+}
+template CommandOption Command::option(const char*, std::string&, const char*) const;
+template CommandOption Command::option(const char*, std::vector<std::string>&, const char*) const;
+template CommandOption Command::option(const char*, std::filesystem::path&, const char*) const;
+template CommandOption Command::option(const char*, uint16_t&, const char*) const;
+template CommandOption Command::option(const char*, std::optional<uint16_t>&, const char*) const;
+template CommandOption Command::option(const char*, int32_t&, const char*) const;
+template CommandOption Command::option(const char*, std::optional<int32_t>&, const char*) const;
+template CommandOption Command::option(const char*, uint32_t&, const char*) const;
+template CommandOption Command::option(const char*, uint64_t&, const char*) const;
+template CommandOption Command::option(const char*, double&, const char*) const;
+
+CommandOption Command::flag(const char* name, bool& target, const char* help) const {
+  return CommandOption(*app_.add_flag(name, target, help));
+}
+
+Command Command::command(const char* name, const char* help) const {
+  return Command(*app_.add_subcommand(name, help));
+}
+
+void Command::needsCommand() const {
+  app_.require_subcommand(1);
+}
+
+void Command::runs(std::function<void()> work) const {
+  app_.callback(std::move(work));
+}
+
+void Command::ends(const char* footer) const {
+  app_.footer(footer);
+}
+
+// Help and version come before commands are added, which take the help over.
+CommandLine::CommandLine(const char* program, const char* description)
+    : CommandLine(std::make_unique<CLI::App>(description, program)) {
+  app_->set_help_flag("-h,--help", "Print this help and exit");
+  app_->set_version_flag("--version", app_->get_name() + " " + programVersion(),
+                         "Print the version and exit");
+  app_->footer("The manual page " + app_->get_name() + " tells more.");
+}
+
+CommandLine::CommandLine(std::unique_ptr<CLI::App> app) : Command(*app), app_(std::move(app)) {}
+
+CommandLine::~CommandLine() = default;
+
+void CommandLine::takesOptionsAnywhere() const {
+  app_->fallthrough();
+}
+
+std::optional<int> CommandLine::parse(int argc, char** argv) const {
   try {
-    app.parse(argc, argv);
+    app_->parse(argc, argv);
     return std::nullopt;
   } catch (const CLI::ParseError& error) {
-    if (error.get_exit_code() == 0) return app.exit(error);  // prints the help or the version
-    complain(app, error.what());
-    std::fprintf(stderr, "Try '%s --help'.\n", understoodCommand(app).c_str());
+    if (error.get_exit_code() == 0) return app_->exit(error);  // prints the help or the version
+    complain(*app_, error.what());
+    std::fprintf(stderr, "Try '%s --help'.\n", understoodCommand(*app_).c_str());
     return kWrongUsage;
   } catch (const std::exception& error) {
-    complain(app, error.what());
+    complain(*app_, error.what());
     return 1;
   }
 }
