@@ -145,6 +145,11 @@ AdministrationAccess administrationAccess(const Settings& settings, Log& log) {
 std::unique_ptr<UnixSocketAcceptor> administrationSocket(const Paths& paths,
                                                          const AdministrationAccess& access, Log& log) {
   auto made = UnixSocketAcceptor::bindForGroup(paths.administration(), access.group);
+  if (const Error* error = std::get_if<Error>(&made); error != nullptr && access.group) {
+    log.error("main: The group \"%s\" cannot look at the daemon: %s", access.groupName.c_str(),
+              error->localizedDescription.c_str());
+    made = UnixSocketAcceptor::bindForGroup(paths.administration(), std::nullopt);
+  }
   if (const Error* error = std::get_if<Error>(&made)) {
     log.error("main: Nobody can look at the daemon: %s", error->localizedDescription.c_str());
     return nullptr;

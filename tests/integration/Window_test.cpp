@@ -123,6 +123,19 @@ TEST_F(Window, ServesWithoutTheGroupThatTheSystemDoesNotKnow) {
   EXPECT_EQ(call("Status").status, 0);
 }
 
+TEST_F(Window, IsOpenToRootWhereTheDaemonMayNotMakeASocketForTheGroup) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root";
+  daemon_.addSettings("[admin]\ngroup = \"adm\"\n");
+  ASSERT_EQ(runProgram("chown", {"-R", std::string(kNobody) + ":" + kNobody, daemon_.root().path()}).status,
+            0);
+  daemon_.setLauncher(asNobody());
+  ASSERT_TRUE(daemon_.startAndWait()) << daemon_.log();
+  EXPECT_TRUE(daemon_.logged("The group \"adm\" cannot look at the daemon: ")) << daemon_.log();
+  EXPECT_EQ(socket().st_mode & 0777U, 0600U);
+  const ProgramRun status = call("Status");
+  EXPECT_EQ(status.status, 0) << status.text;
+}
+
 TEST_F(Window, KeepsNoDaemonFromEndingAndGoesWithIt) {
   daemon_.activateBySocket();
   start();
