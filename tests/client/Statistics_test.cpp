@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <future>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -365,6 +366,22 @@ TEST_F(ClientStatistics, TellWrittenMessagesFromQueuedOnesWhenASessionEnds) {
   EXPECT_EQ(since.lostInQueue, 2U);
   EXPECT_EQ(since.accepted, 3U);
   EXPECT_EQ(since.sent, 0U);
+}
+
+TEST_F(ClientStatistics, CountAMessageWithACompletionThatIsTooLarge) {
+  TestDaemon daemon(socket_);
+  ASSERT_TRUE(daemon.start());
+  const auto session = KYTReporting::open(options());
+  std::promise<std::optional<Error>> told;
+  session->sendMessage(1, 1, {{"text", std::string(1 << 20, 'x')}}, 0,
+                       [&](const Value&, std::optional<Error> error) { told.set_value(std::move(error)); });
+  const auto error = answerOf(told);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, static_cast<int32_t>(ClientError::invalid));
+  const Statistics figures = session->statistics();
+  EXPECT_EQ(figures.accepted, 1U);
+  EXPECT_EQ(figures.droppedUnsendable, 1U);
+  EXPECT_EQ(figures.sent, 0U);
 }
 
 TEST_F(ClientStatistics, CountNoCallsAsMessages) {
