@@ -63,6 +63,7 @@ class EmptyWindow final : public AdministrationInterface {
   std::vector<Dictionary> storebags() override { return {}; }
   std::string metrics() override { return "# EOF\n"; }
   std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
+  std::optional<std::string> reload(std::vector<std::string>& /*lines*/) override { return std::nullopt; }
 };
 
 class NoEntitlements final : public Entitlements {
