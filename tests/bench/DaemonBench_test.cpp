@@ -7,6 +7,7 @@
 #include <sstream>
 
 #include "bench/Rows.h"
+#include "tests/support/Sanitizers.h"
 #include "tools/demo/ChildProcess.h"
 
 namespace kyt::bench {
@@ -39,6 +40,7 @@ std::set<std::string> groups() {
 class DaemonBench : public testing::TestWithParam<std::string> {};
 
 TEST_P(DaemonBench, MeasuresEachRowOfTheGroup) {
+  if (kSanitized) GTEST_SKIP() << "a million events through a sanitizer's daemon take many minutes";
   int status = -1;
   const std::string out = printed({"--programs", KYT_PROGRAMS, "--share", KYT_SHARE, "--only", GetParam(),
                                    "--events", "6000", "--sessions", "20", "--quiet-seconds", "0.2"},
