@@ -109,7 +109,7 @@ std::string textIn(const Dictionary& dictionary, const char* key) {
 }
 
 std::string ruleText(const Dictionary& backEnd, int64_t now) {
-  const std::string rule = textIn(backEnd, "rule");
+  std::string rule = textIn(backEnd, "rule");
   if (rule == "none") return "";
   if (rule != "5xx") return rule;
   return std::to_string(numberIn(backEnd, "status")) + " at " + clockText(numberIn(backEnd, "decided"), now);
