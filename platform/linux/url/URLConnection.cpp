@@ -65,7 +65,8 @@ std::optional<Figures> figuresOf(int socket) {
 bool isUnspecified(const sockaddr_storage& address) {
   if (address.ss_family == AF_INET)
     return reinterpret_cast<const sockaddr_in&>(address).sin_addr.s_addr == INADDR_ANY;
-  return IN6_IS_ADDR_UNSPECIFIED(&reinterpret_cast<const sockaddr_in6&>(address).sin6_addr);
+  return std::memcmp(&reinterpret_cast<const sockaddr_in6&>(address).sin6_addr, &in6addr_any,
+                     sizeof in6addr_any) == 0;
 }
 
 // Whether the address is one of this machine's.
