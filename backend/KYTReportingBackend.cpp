@@ -84,7 +84,8 @@ void KYTReportingBackend::tellOwner(DepartureKind kind, std::string_view address
                             .isAnswered = reply.response.has_value()});
 }
 
-void KYTReportingBackend::takeEvent(bool isInternal) {
+void KYTReportingBackend::takeEvent(bool isInternal, EventKind kind) {
+  kind_ = kind;
   std::shared_ptr<Tally>& tally = tallies_[isInternal ? 1 : 0];
   if (tally == nullptr && program_ != nullptr)
     tally = platform_.books.open(*program_, name_.view(), isInternal);
@@ -92,13 +93,40 @@ void KYTReportingBackend::takeEvent(bool isInternal) {
   if (tally_ != nullptr) tally_->take();
 }
 
-void KYTReportingBackend::dropEvent(Tally* tally, Reason fate) const {
+void KYTReportingBackend::dropEvent(Tally* tally, EventKind kind, Reason fate) const {
   platform_.counters.add(fate);
-  if (tally != nullptr) tally->drop(fate, 1);
+  if (tally == nullptr) return;
+  tally->drop(fate, 1);
+  if (platform_.books.watchers()->anybody()) tellWatchers(*tally, kind, fate);
 }
 
 void KYTReportingBackend::eventDelivered() const {
-  if (tally_ != nullptr) tally_->deliver(1);
+  if (tally_ == nullptr) return;
+  tally_->deliver(1);
+  if (platform_.books.watchers()->anybody()) tellWatchers(*tally_, kind_, std::nullopt);
+}
+
+void KYTReportingBackend::tellWatchers(const Tally& tally, EventKind kind,
+                                       std::optional<Reason> dropped) const {
+  PassedEvent event = tally.passed(kind, dropped);
+  event.backEnd = name_.str();
+  if (dropped) event.rule = ruleFor(*dropped, kind);
+  platform_.books.watchers()->tell(std::move(event));
+}
+
+const char* KYTReportingBackend::ruleFor(Reason fate, EventKind kind) const {
+  switch (fate) {
+    case Reason::eventFiltered:
+    case Reason::batchedEventFiltered:
+      return isWhitelistedEvent(static_cast<uint16_t>(kind.category)) ? "black-list" : "white-list";
+    case Reason::eventDroppedByState:
+    case Reason::batchDiscarded: {
+      const StateRule rule = standing_->state().rule;
+      return rule != StateRule::none ? stateRuleName(rule) : "";
+    }
+    default:
+      return "";
+  }
 }
 
 int32_t KYTReportingBackend::state() const {

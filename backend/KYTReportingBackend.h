@@ -102,9 +102,9 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // The books. Whose events come next; null, as at first: they are counted, and not booked.
   void setProgram(std::shared_ptr<const ReportingProgram> program);
   // Before each event, whatever becomes of it. `isInternal`: a message of the daemon's own.
-  void takeEvent(bool isInternal);
+  void takeEvent(bool isInternal, EventKind kind = {});
   // The event that was taken last.
-  void dropEvent(Reason fate) const { dropEvent(tally_, fate); }
+  void dropEvent(Reason fate) const { dropEvent(tally_, kind_, fate); }
 
   // Read synchronously, written asynchronously on the state queue, so every read sees the writes issued
   // before it.
@@ -174,7 +174,10 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   // The books' side of the event that was taken last; null: it is not booked. It lives until the next setProgram(), which
   // waits for what stands on the state queue.
   [[nodiscard]] Tally* tally() const { return tally_; }
-  void dropEvent(Tally* tally, Reason fate) const;
+  void dropEvent(Tally* tally, EventKind kind, Reason fate) const;
+  // Why this back end drops events for that reason: the list, or the rule of its state. Empty: the reason says all.
+  [[nodiscard]] const char* ruleFor(Reason fate, EventKind kind) const;
+  [[nodiscard]] EventKind eventKind() const { return kind_; }  // of the event that was taken last
   void eventDelivered() const;
   // The answer to the upload of a file or of log data, for the owner of the device. The session's queue.
   void tellOwner(DepartureKind kind, std::string_view address, size_t bytes, const URLReply& reply) const;
@@ -219,7 +222,10 @@ class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBack
   std::array<std::shared_ptr<Tally>, 2>
       tallies_;             // its events, and the daemon's own; opened by the first of each
   Tally* tally_ = nullptr;  // one of them
+  EventKind kind_;
   std::weak_ptr<ReportingSessionConnectivityInterface> reportingSessionConnectivityDelegate_;
+
+  void tellWatchers(const Tally& tally, EventKind kind, std::optional<Reason> dropped) const;
 
   int32_t state_ GUARDED_BY(*stateQueue_) = kBackendStateUndecided;
   std::optional<SessionIDPath> combinedSessionID_ GUARDED_BY(*stateQueue_);

@@ -144,7 +144,7 @@ class ReportingdSession final : public ClientSessionInterface,
                            uint16_t respCode);
   [[nodiscard]] Dictionary envelopeWithPayload(std::optional<Dictionary> payload);
   // An event that no back end gets.
-  void dropEvent(Reason fate);
+  void dropEvent(Reason fate, EventKind kind);
   // At the default level, once for a reason in the session's life, and once a minute for its user and client type.
   void tellDrop(Reason reason, const std::string& why);
   void tellFiltered(const KYTReportingBackend& backend, uint16_t category);

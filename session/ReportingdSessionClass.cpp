@@ -49,11 +49,20 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::sing
   return singleMessageHelper_;
 }
 
-void ReportingdSessionClass::dropEvent(const ReportingProgram& program, Reason fate) const {
+void ReportingdSessionClass::tellWatchers(const Tally& tally, EventKind kind, Reason fate) const {
+  const std::shared_ptr<Watchers>& watchers = platform().books.watchers();
+  if (!watchers->anybody()) return;
+  PassedEvent event = tally.passed(kind, fate);
+  event.backEnd = kNoBackEnd;
+  watchers->tell(std::move(event));
+}
+
+void ReportingdSessionClass::dropEvent(const ReportingProgram& program, EventKind kind, Reason fate) const {
   platform().counters.add(fate);
   const std::shared_ptr<Tally> tally = platform().books.open(program, kNoBackEnd, false);
   tally->take();
   tally->drop(fate, 1);
+  tellWatchers(*tally, kind, fate);
 }
 
 void ReportingdSessionClass::tellFiltered(const KYTReportingBackend& backend, uint16_t category) const {
@@ -83,7 +92,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
   if (!sessionInfo || !storebag) {
     // The leading "R" is part of the message that tools look for.
     log.error("RsendMessageWithSessionInfo: Attempted to send message with one or more nil parameters");
-    dropEvent(*program, storebag ? Reason::identifiersMissing : Reason::noStorebag);
+    dropEvent(*program, {category, type}, storebag ? Reason::identifiersMissing : Reason::noStorebag);
     return;
   }
   char deviceID[kDeviceIDSize] = {};
@@ -93,7 +102,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
       backendFactory_.createBackends(storebag, sessionInfo, userInfo, deviceID);
   if (!backends || backends->empty()) {
     log.error("sendMessageWithSessionInfo: No backends available to send single message");
-    dropEvent(*program, Reason::noBackEnds);
+    dropEvent(*program, {category, type}, Reason::noBackEnds);
     return;
   }
   if (userInfo && !sessionInfo->boolean(kKYTReportingSessionInfoRequireUserInfo))
@@ -105,7 +114,7 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
     backend->setUserAccount(account);
     backend->setAnswerReader(&reader);
     backend->setProgram(program);
-    backend->takeEvent(false);
+    backend->takeEvent(false, {category, type});
     backend->updateState();
     backend->setReportingSessionConnectivityDelegate(helper);
     if (!backend->isWhitelistedEvent(category)) {

@@ -52,11 +52,14 @@ class ReportingdSessionClass {
                                   const std::optional<Dictionary>& payload,
                                   const std::shared_ptr<UserAccount>& account = nullptr);
 
+  // Of an event that no back end took: whoever watches is told.
+  void tellWatchers(const Tally& tally, EventKind kind, Reason fate) const;
+
   // Made at first use; shared by all single messages.
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> singleMessageHelper();
 
  private:
-  void dropEvent(const ReportingProgram& program, Reason fate) const;
+  void dropEvent(const ReportingProgram& program, EventKind kind, Reason fate) const;
   void tellFiltered(const KYTReportingBackend& backend, uint16_t category) const;
   Configuration configuration_;
   BackendFactory& backendFactory_;

@@ -40,19 +40,28 @@ bool isOdd(const Value& value) {
   return !number || *number > kLast16;
 }
 
+EventKind kindOf(const Dictionary& message) {
+  const auto number = [&message](const char* key) {
+    const Value* value = message.find(key);
+    return value != nullptr ? static_cast<int32_t>(value->unsignedIntValue() & 0xffffU) : -1;
+  };
+  return {number(kKYTReportingMessageParametersCategory), number(kKYTReportingMessageParametersType)};
+}
+
 int32_t clientTypeIn(const std::optional<Dictionary>& sessionInfo) {
   return sessionInfo ? sessionInfo->integer(kKYTReportingSessionInfoClientType) : 0;
 }
 
 }  // namespace
 
-void ReportingdSession::dropEvent(Reason fate) {
+void ReportingdSession::dropEvent(Reason fate, EventKind kind) {
   std::shared_ptr<Tally>& tally = withoutBackend_[sendsInternalMessage_ ? 1 : 0];
   if (program_ == nullptr) identifyProgram();
   if (tally == nullptr) tally = platform().books.open(*program_, kNoBackEnd, sendsInternalMessage_);
   counters().add(fate);
   tally->take();
   tally->drop(fate, 1);
+  class_.tellWatchers(*tally, kind, fate);
 }
 
 void ReportingdSession::tellDrop(Reason reason, const std::string& why) {
@@ -82,21 +91,21 @@ void ReportingdSession::tellOddNumbers(const Value& category, const Value& type)
 Value ReportingdSession::sendMessageWithDictionaryError(Dictionary message) {
   if (!hasBackends()) {
     log().debug("sendMessageWithDictionary: No backends available to send message");
-    dropEvent(withoutBackends_);
+    dropEvent(withoutBackends_, kindOf(message));
     tellDrop(withoutBackends_, whyWithoutBackends(withoutBackends_));
     return nullptr;
   }
   const Value* category = message.find(kKYTReportingMessageParametersCategory);
   if (category == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'category'");
-    dropEvent(Reason::categoryOrTypeMissing);
+    dropEvent(Reason::categoryOrTypeMissing, kindOf(message));
     tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
   const Value* type = message.find(kKYTReportingMessageParametersType);
   if (type == nullptr) {
     log().debug("sendMessageWithDictionary: Missing mandatory parameter 'type'");
-    dropEvent(Reason::categoryOrTypeMissing);
+    dropEvent(Reason::categoryOrTypeMissing, kindOf(message));
     tellDrop(Reason::categoryOrTypeMissing, "they have no \"Category\" or no \"Type\"");
     return nullptr;
   }
@@ -142,7 +151,7 @@ Value ReportingdSession::routeToBackends(Dictionary envelope, const TimeValue& t
   size_t left = _backends.size();
   for (const auto& [key, backend] : _backends) {
     --left;
-    backend->takeEvent(sendsInternalMessage_);
+    backend->takeEvent(sendsInternalMessage_, {category, type});
     if (!backend->isWhitelistedEvent(category)) {
       log().debug(
           "sendMessageWithDictionary: Dropping event with category %d as it is not whitelisted for backend %s",
@@ -192,7 +201,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   if (!sessionInfo.contains(kKYTReportingSessionInfoClientType) ||
       !sessionInfo.contains(kKYTReportingSessionInfoSessionID)) {
     log().error("sendMessageWithSessionInfo: Could not retrieve identifiers from sessionInfo");
-    dropEvent(Reason::identifiersMissing);
+    dropEvent(Reason::identifiersMissing, {category, type});
     if (reply) reply("Could not retrieve identifiers from sessionInfo");
     return;
   }
@@ -201,7 +210,7 @@ void ReportingdSession::sendMessageWithSessionInfo(Dictionary sessionInfo, std::
   log().debug("sendMessageWithSessionInfo: Sending message with session info for session %u", _sessionID);
   const std::optional<Dictionary> storebag = _sessionDelegate.storebagForSession(*this);
   if (!storebag) {
-    dropEvent(Reason::noStorebag);
+    dropEvent(Reason::noStorebag, {category, type});
     tellDrop(Reason::noStorebag, whyWithoutBackends(Reason::noStorebag));
     if (reply) reply("storebag not available");
     return;

@@ -53,7 +53,7 @@ bool DashboardBackend::finishUpload(const std::optional<Data>& reply, const std:
   platform().log.normal("DashboardBackend(uploadLogData): Log data uploaded to %s",
                         description(location).c_str());
   // Numbered like every event, but not sent: it ends in the base's operation that does nothing.
-  takeEvent(true);
+  takeEvent(true, {0, 2});
   sendMessage({{"LogDataUploadLocation", location}}, platform().clock.timeOfDay(), 0, 2, MessageFlag{0});
   return true;
 }

@@ -91,9 +91,10 @@ HTTPSPostBackend::~HTTPSPostBackend() {
   drainStateQueue();
   // What no flush took is lost with the session. Nobody else can reach the batch any more.
   if (!batch_.exists()) return;
-  const EventBatch::Taken batch = batch_.take(combinedSessionIDOnQueue());
+  EventBatch::Taken batch = batch_.take(combinedSessionIDOnQueue());
   standing()->setBatch(0, 0);
   giveBackToUser(batch.bytes);
+  showFate(batch.events, batch.records, Reason::batchDiscarded);
   batch.events.drop(platform().counters, Reason::batchDiscarded);
   tellDiscarded(batch.records.size(),
                 lacksUserInfo() ? "user information was promised and is missing"
@@ -218,6 +219,9 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
                        facts().requireUserInfo);
   Array records;
   records.append(Value(std::move(record)));
+  BookedEvents event;
+  event.add(tally());
+  showFate(event, records, std::nullopt);
   const PostRequest post(configuration_, postFacts());
   PostRequest::Message message = makeMessage(post, std::move(records));
   const bool mayBeShown = post.mayBeShown();
@@ -230,8 +234,6 @@ Value HTTPSPostBackend::sendStandalone(Dictionary record, int32_t state, uint16_
       text = Value(formatObjects("Flushed events:\n%@\nStandalone event:\n%@", {flushed, text}));
   }
   if (before != nullptr) immutable_ = true;
-  BookedEvents event;
-  event.add(tally());
   postJSONMessage(std::move(message.json), flag, method, respCode, nullptr,
                   carried(std::move(event), message.events));
   return text;

@@ -138,6 +138,11 @@ class HTTPSPostBackend : public KYTReportingBackend {
   void tellDiscarded(size_t events, const char* why) const;
   [[nodiscard]] bool admits(const Dictionary& record) const;
   [[nodiscard]] EventBatch::Taken recordsToPost(EventBatch::Taken batch) const;
+  // Of a record; a filter may have taken the numbers away.
+  [[nodiscard]] static EventKind kindOf(const Dictionary& record);
+  // Lets watchers, where there are any, be told what becomes of these events, which have those records. `dropped`: of those
+  // that are dropped at once; none: of those that are posted.
+  void showFate(BookedEvents& events, const Array& records, std::optional<Reason> dropped) const;
   [[nodiscard]] BookedEvents carried(BookedEvents events, size_t inMessage) const;
 
   [[nodiscard]] PostFacts postFacts() const;

@@ -34,6 +34,29 @@ void complete(FlushCompletion& completion, Error error) {
 
 }  // namespace
 
+EventKind HTTPSPostBackend::kindOf(const Dictionary& record) {
+  const auto number = [&record](const char* key) {
+    const Value* value = record.find(key);
+    return value != nullptr ? static_cast<int32_t>(value->unsignedIntValue() & 0xffffU) : -1;
+  };
+  return {number("_method"), number("_status")};
+}
+
+void HTTPSPostBackend::showFate(BookedEvents& events, const Array& records,
+                                std::optional<Reason> dropped) const {
+  const std::shared_ptr<Watchers>& watchers = platform().books.watchers();
+  if (!watchers->anybody()) return;
+  BookedEvents::Shown shown{watchers, name().str(), "", {}, nullptr};
+  if (dropped)
+    shown.rule = ruleFor(*dropped, {});
+  else
+    shown.post = std::make_shared<WatchedPost>(watchers);
+  shown.kinds.reserve(records.size());
+  for (const Value& record : records)
+    shown.kinds.push_back(record.dictionary() != nullptr ? kindOf(*record.dictionary()) : EventKind());
+  events.show(std::move(shown));
+}
+
 Value HTTPSPostBackend::batchEvent(Dictionary record) {
   const int32_t method = record.integer("_method");
   uint64_t batched = 0;
@@ -134,6 +157,7 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
   switch (taking) {
     case BatchTaking::discarded:
       giveBackToUser(batch.bytes);
+      showFate(batch.events, batch.records, Reason::batchDiscarded);
       batch.events.drop(platform().counters, Reason::batchDiscarded);
       if (lacksUserInfo())
         tellDiscarded(batch.records.size(), "user information was promised and is missing");
@@ -166,6 +190,7 @@ Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, Flush
   const bool mayBeShown = post.mayBeShown();
   const bool mayGoBeside =
       !completion && text == TextOf::flush && bytes >= PostLine::kLeastBytes && decision_.postURL;
+  showFate(batch.events, batch.records, std::nullopt);
   PostRequest::Message message = makeMessage(post, std::move(batch.records));
   if (!blocking && message.json.size() >= kTakesLong) blocking.emplace();
   Value pretty;
@@ -243,12 +268,12 @@ EventBatch::Taken HTTPSPostBackend::recordsToPost(EventBatch::Taken batch) const
     Dictionary* record = values[i].mutableDictionary();
     Tally* tally = tallies.next();
     if (!admits(*record)) {
-      dropEvent(tally, Reason::batchedEventFiltered);
+      dropEvent(tally, kindOf(*record), Reason::batchedEventFiltered);
       continue;
     }
     record->merge(information);
     if (mayOutgrow && (bytes += roughSize(*record)) > limit) {
-      dropEvent(tally, Reason::batchFull);
+      dropEvent(tally, kindOf(*record), Reason::batchFull);
       tellDroppedByLimit();
       continue;
     }

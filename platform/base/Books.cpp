@@ -31,14 +31,6 @@ constexpr uint32_t kAllUsers = ~uint32_t{0};
 // Programs without rows that are told from each other.
 constexpr size_t kMostMerged = 4096;
 
-// The longest beginning of whole UTF-8 characters.
-std::string_view cutName(std::string_view name) {
-  if (name.size() <= Limits::maxBookNameBytes) return name;
-  size_t end = Limits::maxBookNameBytes;
-  while (end > 0 && (static_cast<unsigned char>(name[end]) & 0xC0) == 0x80) --end;
-  return name.substr(0, end);
-}
-
 size_t hashOf(const ReportingProgram& program) {
   const std::string text = std::to_string(program.user) + '/' + std::to_string(program.clientType) + '/' +
                            std::to_string(program.clientName.size()) + '/' + program.clientName +
@@ -213,6 +205,16 @@ void Tally::drop(Reason fate, size_t events) {
     state_->recent.addDropped(state_->clock->monotonic(), number, events);
 }
 
+PassedEvent Tally::passed(EventKind kind, std::optional<Reason> dropped) const {
+  PassedEvent event;
+  event.program = program_;
+  event.isInternal = row_.isInternal;
+  event.kind = kind;
+  event.dropped = dropped;
+  if (state_->clock != nullptr) event.seconds = state_->clock->timeOfDay().seconds;
+  return event;
+}
+
 BookedEvents BookedEvents::unbooked(size_t events) {
   BookedEvents made;
   made.add(nullptr, events);
@@ -263,10 +265,27 @@ void BookedEvents::endWaiting() const {
 }
 void BookedEvents::deliver() const {
   forEachRun([](Tally& tally, size_t events) { tally.deliver(events); });
+  if (shown_ != nullptr) tellWatchers(std::nullopt);
 }
 void BookedEvents::drop(Counters& counters, Reason fate) const {
   counters.add(fate, size_);
   forEachRun([fate](Tally& tally, size_t events) { tally.drop(fate, events); });
+  if (shown_ != nullptr) tellWatchers(fate);
+}
+
+void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
+  BookedEventsReader tallies(*this);
+  const bool isPosted = shown_->post != nullptr && shown_->post->number() != 0;
+  for (size_t i = 0; i < size_; ++i) {
+    const Tally* tally = tallies.next();
+    if (tally == nullptr) continue;
+    PassedEvent event = tally->passed(i < shown_->kinds.size() ? shown_->kinds[i] : EventKind(), dropped);
+    event.backEnd = shown_->backEnd;
+    if (dropped) event.rule = shown_->rule;
+    if (isPosted) event.post = shown_->post;
+    event.isFirstOfPost = isPosted && i == 0;
+    shown_->watchers->tell(std::move(event));
+  }
 }
 
 Tally* BookedEventsReader::next() {

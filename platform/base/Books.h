@@ -13,10 +13,10 @@
 
 #include <array>
 #include <atomic>
-#include <compare>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -25,17 +25,10 @@
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/RecentFates.h"
+#include "platform/base/ReportingProgram.h"
+#include "platform/base/Watchers.h"
 
 namespace kyt {
-
-// Whose events: what the kernel says of the client's user, and what the client says of itself. A session that has not yet
-// said its names is a program with empty ones.
-struct ReportingProgram {
-  uint32_t user = 0;
-  int32_t clientType = 0;
-  std::string clientName, service;
-  friend auto operator<=>(const ReportingProgram&, const ReportingProgram&) = default;
-};
 
 // The back end of events that none took.
 inline constexpr std::string_view kNoBackEnd = "-";
@@ -85,11 +78,15 @@ class Books {
   // Of the programs' events, not the daemon's own, by back end. Without a clock all 0.
   [[nodiscard]] FateFigures lastHour() const;
 
+  // Who watches events get their fates. Whoever books a fate tells them, where anybody watches.
+  [[nodiscard]] const std::shared_ptr<Watchers>& watchers() const { return watchers_; }
+
  private:
   friend class Tally;
   struct Row;
   struct State;
   const std::shared_ptr<State> state_;
+  const std::shared_ptr<Watchers> watchers_ = std::make_shared<Watchers>();
 };
 
 // One back end's part of a row. take() belongs to the queue of its session, enterBatch() to the one that guards the batch;
@@ -104,6 +101,8 @@ class Tally final : public std::enable_shared_from_this<Tally> {
 
   // Whose events these are. Any thread.
   [[nodiscard]] const ReportingProgram& program() const { return program_; }
+  // One of its events, for watchers.
+  [[nodiscard]] PassedEvent passed(EventKind kind, std::optional<Reason> dropped) const;
 
   void take() { addByOneWriter(taken_); }
   void enterBatch() { addByOneWriter(batched_); }
@@ -136,6 +135,19 @@ class BookedEvents {
   // Of no tally: counted, not booked.
   static BookedEvents unbooked(size_t events);
 
+  // What watchers are told of them besides what their tallies say.
+  struct Shown {
+    std::shared_ptr<Watchers> watchers;
+    std::string backEnd;
+    const char* rule = "";         // where they are dropped
+    std::vector<EventKind> kinds;  // of each, in order
+    std::shared_ptr<WatchedPost> post;
+  };
+  // From now on whoever watches is told their fate. Only where anybody watches, and once they are complete.
+  void show(Shown shown) { shown_ = std::make_shared<const Shown>(std::move(shown)); }
+  // What carries them; null: they are not shown, or not posted.
+  [[nodiscard]] WatchedPost* watchedPost() const { return shown_ != nullptr ? shown_->post.get() : nullptr; }
+
   void add(Tally* tally, size_t events = 1);  // null: of none
   [[nodiscard]] size_t size() const { return size_; }
 
@@ -159,9 +171,11 @@ class BookedEvents {
   };
   template <typename Operation>
   void forEachRun(Operation operation) const;
+  void tellWatchers(std::optional<Reason> dropped) const;
 
   std::vector<Run> runs_;
   size_t size_ = 0;
+  std::shared_ptr<const Shown> shown_;  // null: nobody is told
 };
 
 // The tally of each event, in order; null past the last.

@@ -89,6 +89,13 @@ struct Limits {
   static constexpr size_t maxBookNameBytes = 128;   // what is longer is cut
   // That one answer to an administrator shows: some 700 bytes each, and two megabytes wait for nobody.
   static constexpr size_t maxShownSessions = 2048;
+  // Who watches events pass: each is looked for with every event while anybody watches.
+  static constexpr size_t maxWatchers = 4;
+  static constexpr size_t maxWatchedEvents = 1024;  // that wait for one: some 700 bytes each; a power of two
+  static constexpr size_t maxWatchedBodyBytes = 65536;  // of one body, the beginning
+  static constexpr size_t maxWatchedBodies = 4u
+                                             << 20;  // bytes, for all watchers; further bodies are left out
+  static constexpr std::chrono::milliseconds watchPeriod{100};  // between looks at what waits for a watcher
 };
 
 }  // namespace kyt

@@ -1,0 +1,133 @@
+// Who watches events pass: whoever ends an event's road tells it here, and each watcher has a ring of its own for those that
+// its filter lets through. While nobody watches, that is one relaxed load. While somebody does, nobody waits for a watcher:
+// what finds a ring full is counted as its loss and forgotten.
+//
+// The books own the one object (Books::watchers()); posts on their way and watchers share it. Any thread.
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/ReportingProgram.h"
+
+namespace kyt {
+
+// An event's category and type; -1: it has none.
+struct EventKind {
+  int32_t category = -1, type = -1;
+};
+
+class Watchers;
+
+// A request that carries watched events. It has one user at a time until it is answered, and never changes then.
+class WatchedPost {
+ public:
+  explicit WatchedPost(std::shared_ptr<Watchers> watchers) : watchers_(std::move(watchers)) {}
+  ~WatchedPost();
+  WatchedPost(const WatchedPost&) = delete;
+  WatchedPost& operator=(const WatchedPost&) = delete;
+
+  // The request is made: to which server, and the text of its body before compression. The text is kept where somebody wants
+  // it and Limits::maxWatchedBodies has room, its first Limits::maxWatchedBodyBytes.
+  void leaves(std::string_view server, std::string_view body);
+  void answered(int status) { status_ = status; }
+
+  [[nodiscard]] uint64_t number() const { return number_; }  // 0: no request was made
+  [[nodiscard]] const std::string& server() const { return server_; }
+  [[nodiscard]] const std::string& body() const { return body_; }
+  [[nodiscard]] size_t bodyBytes() const { return bodyBytes_; }  // of the whole text
+  [[nodiscard]] int status() const { return status_; }           // 0: no answer came
+
+ private:
+  const std::shared_ptr<Watchers> watchers_;
+  uint64_t number_ = 0;
+  std::string server_, body_;
+  size_t bodyBytes_ = 0;
+  int status_ = 0;
+};
+
+// One event, when it is known what became of it.
+struct PassedEvent {
+  ReportingProgram program;  // its names cut as in the books
+  std::string backEnd;
+  bool isInternal = false;
+  EventKind kind;
+  std::optional<Reason> dropped;  // none: delivered
+  const char* rule = "";  // what made a back end drop it, a word with hyphens; empty: the reason says all
+  int64_t seconds = 0;    // since 1970
+  std::shared_ptr<const WatchedPost> post;  // null: no request carried it
+  bool isFirstOfPost = false;
+};
+
+struct WatchFilter {
+  std::optional<uint32_t> user = std::nullopt;
+  std::optional<std::string> client = std::nullopt;  // the name, as the books have it
+  std::optional<uint16_t> category = std::nullopt;
+  bool bodies = false;
+  [[nodiscard]] bool admits(const PassedEvent& event) const;
+};
+
+// One watcher's end. One thread at a time. Its destructor waits for those who tell it something at that moment.
+class Watcher {
+ public:
+  Watcher(std::shared_ptr<Watchers> watchers, size_t place, bool bodies)
+      : watchers_(std::move(watchers)), place_(place), bodies_(bodies) {}
+  ~Watcher();
+  Watcher(const Watcher&) = delete;
+  Watcher& operator=(const Watcher&) = delete;
+
+  [[nodiscard]] std::shared_ptr<const PassedEvent> next();  // null: none waits
+  // How many found the ring full since this was asked last.
+  [[nodiscard]] uint64_t takeLost();
+  [[nodiscard]] bool wantsBodies() const { return bodies_; }
+
+ private:
+  const std::shared_ptr<Watchers> watchers_;
+  const size_t place_;
+  const bool bodies_;
+};
+
+class Watchers : public std::enable_shared_from_this<Watchers> {
+ public:
+  Watchers();
+  ~Watchers();
+  Watchers(const Watchers&) = delete;
+  Watchers& operator=(const Watchers&) = delete;
+
+  // Null where Limits::maxWatchers watch already.
+  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter);
+
+  // Asked before anything is made for telling.
+  [[nodiscard]] bool anybody() const { return watching_.load(std::memory_order_relaxed) != 0; }
+  void tell(PassedEvent event);
+
+ private:
+  friend class Watcher;
+  friend class WatchedPost;
+  struct Ring;
+  struct Place {
+    std::atomic<Ring*> ring{nullptr};
+    std::atomic<uint32_t> tellers{0};  // that may be using it
+  };
+  [[nodiscard]] bool wantsBodies() const { return wantingBodies_.load(std::memory_order_relaxed) != 0; }
+  [[nodiscard]] bool takeRoom(size_t bytes);
+  void end(size_t place, bool bodies);
+
+  std::array<Place, Limits::maxWatchers> places_;
+  std::atomic<uint32_t> watching_{0}, wantingBodies_{0};
+  std::atomic<uint64_t> posts_{0};
+  std::atomic<size_t> bodyBytes_{0};  // of all bodies that are kept
+  Mutex mutex_;                       // for coming and going
+};
+
+}  // namespace kyt

@@ -1,0 +1,189 @@
+#include "platform/base/Watchers.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/base/Books.h"
+#include "platform/base/WatchRing.h"
+
+namespace kyt {
+namespace {
+
+PassedEvent event(int32_t category, uint32_t user = 1000, std::string client = "a") {
+  PassedEvent made;
+  made.program = {user, 7, std::move(client), "s"};
+  made.kind = {category, 1};
+  return made;
+}
+
+class WatchersTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<Watchers> watchers_ = std::make_shared<Watchers>();
+};
+
+TEST_F(WatchersTest, KnowWhetherAnybodyWatches) {
+  EXPECT_FALSE(watchers_->anybody());
+  auto watcher = watchers_->watch({});
+  EXPECT_TRUE(watchers_->anybody());
+  watcher.reset();
+  EXPECT_FALSE(watchers_->anybody());
+}
+
+TEST_F(WatchersTest, TellEachWhatItsFilterLetsThrough) {
+  const auto all = watchers_->watch({});
+  const auto ofUser = watchers_->watch({.user = 1001});
+  const auto ofClient = watchers_->watch({.client = "b"});
+  const auto ofCategory = watchers_->watch({.category = 3});
+  watchers_->tell(event(1));
+  watchers_->tell(event(2, 1001));
+  watchers_->tell(event(3, 1000, "b"));
+  for (int32_t category = 1; category <= 3; ++category) EXPECT_EQ(all->next()->kind.category, category);
+  EXPECT_EQ(all->next(), nullptr);
+  EXPECT_EQ(ofUser->next()->kind.category, 2);
+  EXPECT_EQ(ofUser->next(), nullptr);
+  EXPECT_EQ(ofClient->next()->kind.category, 3);
+  EXPECT_EQ(ofClient->next(), nullptr);
+  EXPECT_EQ(ofCategory->next()->program.clientName, "b");
+  EXPECT_EQ(ofCategory->next(), nullptr);
+}
+
+TEST_F(WatchersTest, AreFewAtATime) {
+  std::vector<std::unique_ptr<Watcher>> all;
+  for (size_t i = 0; i < Limits::maxWatchers; ++i) all.push_back(watchers_->watch({}));
+  EXPECT_NE(all.back(), nullptr);
+  EXPECT_EQ(watchers_->watch({}), nullptr);
+  all.pop_back();
+  EXPECT_NE(watchers_->watch({}), nullptr);
+}
+
+TEST_F(WatchersTest, CountWhatFindsNoRoomAndKeepTheOldest) {
+  const auto idle = watchers_->watch({});
+  const auto quick = watchers_->watch({});
+  const auto most = static_cast<int32_t>(Limits::maxWatchedEvents);
+  for (int32_t i = 0; i < most + 5; ++i) {
+    watchers_->tell(event(i));
+    ASSERT_EQ(quick->next()->kind.category, i);
+  }
+  EXPECT_EQ(quick->takeLost(), 0U);
+  EXPECT_EQ(idle->takeLost(), 5U);
+  EXPECT_EQ(idle->takeLost(), 0U);
+  for (int32_t i = 0; i < most; ++i) ASSERT_EQ(idle->next()->kind.category, i);
+  EXPECT_EQ(idle->next(), nullptr);
+  watchers_->tell(event(1));
+  EXPECT_NE(idle->next(), nullptr);
+}
+
+TEST_F(WatchersTest, CutNamesAsTheBooksDo) {
+  const auto watcher = watchers_->watch({});
+  watchers_->tell(event(1, 1, std::string(Limits::maxBookNameBytes + 9, 'n')));
+  EXPECT_EQ(watcher->next()->program.clientName.size(), Limits::maxBookNameBytes);
+}
+
+TEST_F(WatchersTest, KeepBodiesWhereSomebodyWantsThemAndThereIsRoom) {
+  const auto withoutBodies = watchers_->watch({});
+  const auto post = [this](size_t bytes) {
+    auto made = std::make_shared<WatchedPost>(watchers_);
+    made->leaves("https://a", std::string(bytes, 'b'));
+    EXPECT_EQ(made->bodyBytes(), bytes);
+    return made;
+  };
+  EXPECT_EQ(post(10)->body(), "");
+  const auto watcher = watchers_->watch({.bodies = true});
+  EXPECT_EQ(post(10)->body(), "bbbbbbbbbb");
+  std::vector<std::shared_ptr<WatchedPost>> kept;
+  for (size_t i = 0; i < Limits::maxWatchedBodies / Limits::maxWatchedBodyBytes; ++i) {
+    kept.push_back(post(Limits::maxWatchedBodyBytes + 1));
+    ASSERT_EQ(kept.back()->body().size(), Limits::maxWatchedBodyBytes);
+  }
+  EXPECT_EQ(post(10)->body(), "");
+  kept.pop_back();
+  EXPECT_EQ(post(10)->body(), "bbbbbbbbbb");
+}
+
+TEST_F(WatchersTest, AreToldByTheBooksWhatBecameOfAPost) {
+  Books books;
+  Counters counters;
+  const auto watcher = books.watchers()->watch({});
+  const auto tally = books.open({1000, 7, "a", "s"}, "httppost", false);
+  BookedEvents events;
+  tally->take();
+  events.add(tally.get());
+  tally->take();
+  events.add(tally.get());
+  const auto post = std::make_shared<WatchedPost>(books.watchers());
+  post->leaves("https://a", "[]");
+  events.show({books.watchers(), "httppost", "", {{5, 1}, {6, 2}}, post});
+  {
+    PostedEvents posted(std::move(events), counters);
+    EXPECT_EQ(watcher->next(), nullptr);
+    posted.events()->watchedPost()->answered(503);
+    posted.dropped(Reason::postRefused);
+  }
+  const auto first = watcher->next(), second = watcher->next();
+  ASSERT_NE(second, nullptr);
+  EXPECT_EQ(first->kind.category, 5);
+  EXPECT_TRUE(first->isFirstOfPost);
+  EXPECT_EQ(second->kind.type, 2);
+  EXPECT_FALSE(second->isFirstOfPost);
+  EXPECT_EQ(second->dropped, Reason::postRefused);
+  EXPECT_EQ(second->post->status(), 503);
+  EXPECT_EQ(second->backEnd, "httppost");
+  EXPECT_EQ(watcher->next(), nullptr);
+}
+
+// For the thread sanitizer too: everything that was told arrived or is counted, in each teller's order.
+TEST_F(WatchersTest, LoseNothingUncountedHoweverManyTell) {
+  constexpr uint32_t kTellers = 4, kEach = 20000;
+  const auto watcher = watchers_->watch({});
+  std::vector<std::thread> tellers;
+  std::atomic<uint32_t> done{0};
+  for (uint32_t user = 0; user < kTellers; ++user)
+    tellers.emplace_back([this, user, &done] {
+      for (uint32_t i = 0; i < kEach; ++i) watchers_->tell(event(static_cast<int32_t>(i), user));
+      ++done;
+    });
+  uint64_t told = 0;
+  std::vector<int32_t> latest(kTellers, -1);
+  for (;;) {
+    const bool last = done == kTellers;
+    while (const auto passed = watcher->next()) {
+      ++told;
+      EXPECT_GT(passed->kind.category, latest[passed->program.user]);
+      latest[passed->program.user] = passed->kind.category;
+    }
+    if (last) break;
+    std::this_thread::yield();
+  }
+  for (std::thread& teller : tellers) teller.join();
+  EXPECT_EQ(told + watcher->takeLost(), uint64_t{kTellers} * kEach);
+  EXPECT_GT(told, 0U);
+}
+
+TEST_F(WatchersTest, ComeAndGoWhileOthersTell) {
+  std::atomic<bool> over{false};
+  std::vector<std::thread> tellers;
+  for (uint32_t user = 0; user < 3; ++user)
+    tellers.emplace_back([this, user, &over] {
+      while (!over) {
+        watchers_->tell(event(1, user));
+        std::this_thread::yield();
+      }
+    });
+  for (int i = 0; i < 60; ++i) {
+    const auto watcher = watchers_->watch({.user = 1});
+    ASSERT_NE(watcher, nullptr);
+    std::shared_ptr<const PassedEvent> passed;
+    while (passed == nullptr) passed = watcher->next();
+    EXPECT_EQ(passed->program.user, 1U);
+  }
+  over = true;
+  for (std::thread& teller : tellers) teller.join();
+  EXPECT_FALSE(watchers_->anybody());
+}
+
+}  // namespace
+}  // namespace kyt
