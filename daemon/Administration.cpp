@@ -3,8 +3,13 @@
 #include <memory>
 #include <utility>
 
+#include "daemon/WatchedEvents.h"
 #include "platform/Platform.h"
+#include "platform/base/Books.h"
+#include "platform/base/Limits.h"
 #include "platform/queues/Log.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/Timer.h"
 
 namespace kyt {
 
@@ -21,7 +26,8 @@ std::string refusalOf(const AdministrationAccess& access) {
 // One connection's.
 class Administration::Window final : public AdministrationInterface {
  public:
-  Window(const Administration& all, bool mayLook) : all_(all), mayLook_(mayLook) {}
+  Window(const Administration& all, bool mayLook, bool maySeeBodies, std::shared_ptr<SerialQueue> queue)
+      : all_(all), mayLook_(mayLook), maySeeBodies_(maySeeBodies), queue_(std::move(queue)) {}
   [[nodiscard]] const char* refusal() const override { return mayLook_ ? nullptr : all_.refusal_.c_str(); }
   [[nodiscard]] Dictionary status() override { return all_.status(); }
   [[nodiscard]] std::vector<Dictionary> sessions() override { return all_.sessions(); }
@@ -34,11 +40,74 @@ class Administration::Window final : public AdministrationInterface {
   [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) override {
     return all_.reload(lines);
   }
+  [[nodiscard]] std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) override;
 
  private:
   const Administration& all_;
-  const bool mayLook_;
+  const bool mayLook_, maySeeBodies_;
+  const std::shared_ptr<SerialQueue> queue_;  // the connection's
+  std::shared_ptr<Watching> watching_;
 };
+
+// Gives a connection what its watcher has, as fast as the peer reads it. The connection's queue.
+class Administration::Watching {
+ public:
+  Watching(std::unique_ptr<Watcher> watcher, PassedSignal signal)
+      : watcher_(std::move(watcher)), signal_(std::move(signal)) {}
+
+  // A timer looks, so that whoever tells an event wakes nobody.
+  static void start(const std::shared_ptr<Watching>& watching, TimerService& timers,
+                    const std::shared_ptr<SerialQueue>& queue) {
+    watching->timer_ = timers.every(Limits::watchPeriod, Limits::watchPeriod / 2, queue,
+                                    [weak = std::weak_ptr<Watching>(watching)] {
+                                      if (const auto self = weak.lock()) self->show();
+                                    });
+  }
+
+ private:
+  // What the peer has no room for is tried again; meanwhile the ring fills.
+  void show() {
+    for (size_t i = 0; i < Limits::maxWatchedEvents; ++i) {
+      if (!waiting_) {
+        const std::shared_ptr<const PassedEvent> event = watcher_->next();
+        if (event == nullptr) return;
+        waiting_ = passedView(*event, watcher_->wantsBodies());
+      }
+      lost_ += watcher_->takeLost();
+      if (lost_ != 0) waiting_->set("lost", lost_);
+      if (!signal_(*waiting_)) return;
+      waiting_.reset();
+      lost_ = 0;
+    }
+  }
+
+  const std::unique_ptr<Watcher> watcher_;
+  PassedSignal signal_;
+  std::optional<Dictionary> waiting_;  // taken from the ring, and not sent
+  uint64_t lost_ = 0;                  // not told yet
+  TimerHandle timer_;
+};
+
+std::optional<WatchRefusal> Administration::Window::watch(const Dictionary& filter, PassedSignal signal) {
+  WatchFilter wanted;
+  if (const char* problem = readWatchFilter(filter, wanted))
+    return WatchRefusal{WatchRefusal::Why::wrongFilter, problem};
+  if (wanted.bodies && !maySeeBodies_)
+    return WatchRefusal{WatchRefusal::Why::notAllowed,
+                        "Only root and the daemon's own user may see what is in events"};
+  watching_.reset();
+  std::unique_ptr<Watcher> watcher = all_.watch(std::move(wanted));
+  if (watcher == nullptr)
+    return WatchRefusal{WatchRefusal::Why::tooMany,
+                        std::to_string(Limits::maxWatchers) + " watch already: no more can"};
+  watching_ = std::make_shared<Watching>(std::move(watcher), std::move(signal));
+  Watching::start(watching_, all_.sources_.platform.timers, queue_);
+  return std::nullopt;
+}
+
+std::unique_ptr<Watcher> Administration::watch(WatchFilter filter) const {
+  return sources_.platform.books.watchers()->watch(std::move(filter));
+}
 
 Administration::Administration(AdministrationSources sources, AdministrationAccess access)
     : sources_(std::move(sources)), access_(std::move(access)), refusal_(refusalOf(access_)) {}
@@ -46,12 +115,12 @@ Administration::Administration(AdministrationSources sources, AdministrationAcce
 bool Administration::listenerShouldAcceptNewConnection(Listener& /*listener*/,
                                                        const std::shared_ptr<Connection>& connection) {
   const uint32_t user = connection->peerUser();
-  const bool mayLook =
-      user == 0 || user == access_.user || (access_.group && connection->isPeerInGroup(*access_.group));
+  const bool ownsDaemon = user == 0 || user == access_.user;
+  const bool mayLook = ownsDaemon || (access_.group && connection->isPeerInGroup(*access_.group));
   if (!mayLook)
     sources_.platform.log.debug("administration: Connection %s may not look",
                                 connection->description().c_str());
-  connection->setExportedObject(std::make_shared<Window>(*this, mayLook));
+  connection->setExportedObject(std::make_shared<Window>(*this, mayLook, ownsDaemon, connection->queue()));
   connection->resume();
   return true;
 }

@@ -9,11 +9,13 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
 #include "platform/base/ServerRecords.h"
+#include "platform/base/Watchers.h"
 #include "platform/ipc/AdministrationInterface.h"
 #include "platform/ipc/Listener.h"
 #include "platform/objects/Value.h"
@@ -68,12 +70,15 @@ class Administration final : public ListenerDelegate {
   [[nodiscard]] std::vector<Dictionary> storebags() const;
   [[nodiscard]] std::string metrics() const;
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
+  // Begins to watch; null where the limit of watchers is reached.
+  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter) const;
   [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) const {
     return sources_.reload(lines);
   }
 
  private:
   class Window;
+  class Watching;
   const AdministrationSources sources_;
   const AdministrationAccess access_;
   const std::string refusal_;

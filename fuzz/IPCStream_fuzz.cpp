@@ -64,6 +64,11 @@ class EmptyWindow final : public AdministrationInterface {
   std::string metrics() override { return "# EOF\n"; }
   std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
   std::optional<std::string> reload(std::vector<std::string>& /*lines*/) override { return std::nullopt; }
+  std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) override {
+    if (filter.empty()) return WatchRefusal{WatchRefusal::Why::tooMany, "too many"};
+    static_cast<void>(signal(filter));
+    return std::nullopt;
+  }
 };
 
 class NoEntitlements final : public Entitlements {

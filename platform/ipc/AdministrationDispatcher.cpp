@@ -17,6 +17,7 @@ struct Call {
   AdministrationInterface& window;
   BodyReader& in;
   CallReply& reply;
+  const std::shared_ptr<ConnectionOutput>& output;
 };
 
 using Handler = void (*)(const Call&, std::string_view replySignature);
@@ -59,6 +60,43 @@ void reload(const Call& call, std::string_view signature) {
     call.reply.answer(signature, [&](MessageWriter& out) { out.writeStrings(lines); });
 }
 
+// What is too large for a message is lost as if it were sent: no later moment is better.
+PassedSignal passedSignal(const std::shared_ptr<ConnectionOutput>& output) {
+  return [output](const Dictionary& passed) {
+    const auto sent = output->send(
+        [&](MessageWriter& out, uint32_t serial) {
+          out.beginSignal(serial, wire::kSessionPath, wire::kAdministrationInterface, kPassedSignal,
+                          kPassedSignature);
+          out.writeDictionary(passed);
+          return out.end();
+        },
+        ConnectionOutput::Kind::optional);
+    return sent == ConnectionOutput::Sent::yes || sent == ConnectionOutput::Sent::refused;
+  };
+}
+
+std::string_view errorName(WatchRefusal::Why why) {
+  switch (why) {
+    case WatchRefusal::Why::tooMany:
+      return wire::kErrorLimitsExceeded;
+    case WatchRefusal::Why::notAllowed:
+      return wire::kErrorAccessDenied;
+    case WatchRefusal::Why::wrongFilter:
+      break;
+  }
+  return wire::kErrorInvalidArgs;
+}
+
+void watch(const Call& call, std::string_view /*signature*/) {
+  Dictionary filter;
+  call.in.readDictionary(filter);
+  if (call.in.finish() != BodyStatus::ok) return;
+  if (const auto refusal = call.window.watch(filter, passedSignal(call.output)))
+    call.reply.error(errorName(refusal->why), refusal->text);
+  else
+    call.reply.answerNothing();
+}
+
 // Each at the place of its row in kAdministrationMethods.
 constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     status,
@@ -68,6 +106,7 @@ constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     metrics,
     setLogLevel,
     reload,
+    watch,
 };
 
 size_t numberOf(std::string_view member) {
@@ -104,7 +143,7 @@ const char* AdministrationDispatcher::handle(const Message& message, const Peer&
   CallReply reply(message, peer.output);
   BodyReader in(message);
   if (in.hasSignature(kAdministrationMethods[number].signature))
-    kHandlers[number]({window, in, reply}, kAdministrationMethods[number].reply);
+    kHandlers[number]({window, in, reply, peer.output}, kAdministrationMethods[number].reply);
   switch (in.finish()) {
     case BodyStatus::ok:
       return nullptr;

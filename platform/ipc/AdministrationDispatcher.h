@@ -24,8 +24,9 @@ inline constexpr std::array kAdministrationMethods{
     AdministrationContract{"Status", "", "a{sv}"}, AdministrationContract{"Sessions", "", "aa{sv}"},
     AdministrationContract{"Books", "", "aa{sv}"}, AdministrationContract{"Storebags", "", "aa{sv}"},
     AdministrationContract{"Metrics", "", "s"},    AdministrationContract{"SetLogLevel", "s", ""},
-    AdministrationContract{"Reload", "", "as"},
+    AdministrationContract{"Reload", "", "as"},    AdministrationContract{"Watch", "a{sv}", ""},
 };
+inline constexpr std::string_view kPassedSignal = "Passed", kPassedSignature = "a{sv}";
 
 class AdministrationDispatcher final : public MessageDispatcher {
  public:

@@ -6,15 +6,26 @@
 // session shows is published by it.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/base/Function.h"
 #include "platform/ipc/Listener.h"
 #include "platform/objects/Value.h"
 
 namespace kyt {
+
+// Sends the signal Passed. False: not now, since the peer has not read what was sent before.
+using PassedSignal = Function<bool(const Dictionary& passed)>;
+
+struct WatchRefusal {
+  enum class Why : uint8_t { wrongFilter, tooMany, notAllowed };
+  Why why = Why::wrongFilter;
+  std::string text;
+};
 
 class AdministrationInterface : public ExportedObject {
  public:
@@ -28,6 +39,9 @@ class AdministrationInterface : public ExportedObject {
   [[nodiscard]] virtual std::string metrics() = 0;
   // "debug", "default" or "error", until the daemon ends. What is wrong with it, or none.
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;
+  // From now on the peer is told of events as they pass, by the signal, on the connection's queue, until its end. Another call
+  // puts another filter in place of the first. Why not, or none.
+  [[nodiscard]] virtual std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) = 0;
   // Takes up changed settings: a line for each that differs, in `lines`. What is wrong with their file, when nothing was
   // taken up; or none.
   [[nodiscard]] virtual std::optional<std::string> reload(std::vector<std::string>& lines) = 0;

@@ -16,6 +16,7 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
   {
     MutexLock lock(mutex_);
     if (stream_ == nullptr || dead_) return Sent::closed;
+    if (kind == Kind::optional && waiting_) return Sent::queueFull;
     std::string& queue = open_ ? pending_.end() : early_;
     const size_t before = queue.size();
     if (++lastSerial_ == 0) ++lastSerial_;

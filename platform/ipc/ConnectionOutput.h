@@ -47,6 +47,7 @@ class ConnectionOutput {
   enum class Kind : uint8_t {
     ordinary,
     droppable,  // not sent where it would pass the limit
+    optional,  // not sent while anything waits for the socket: a client that does not read costs one such message
     vital,  // sent past every limit, and never the reason why the connection ends: the caller sees to it that
             // such messages are few
   };
@@ -55,7 +56,7 @@ class ConnectionOutput {
     yes,
     closed,     // nobody is there any more
     refused,    // it cannot be written as a message: too long, or nested too deeply
-    queueFull,  // it is droppable, and would have passed the limit
+    queueFull,  // it is droppable and would have passed the limit, or optional and would have had to wait
   };
   // Writes one whole message.
   Sent send(Builder build, Kind kind = Kind::ordinary);

@@ -161,6 +161,16 @@ void MessageWriter::beginReply(uint32_t serial, uint32_t replySerial, std::strin
   endHeader();
 }
 
+void MessageWriter::beginSignal(uint32_t serial, std::string_view path, std::string_view interface,
+                                std::string_view member, std::string_view signature) {
+  begin(wire::MessageType::signal, wire::kNoReplyExpected, serial);
+  fieldText(wire::Field::path, 'o', path);
+  fieldText(wire::Field::interface, 's', interface);
+  fieldText(wire::Field::member, 's', member);
+  fieldText(wire::Field::signature, 'g', signature);
+  endHeader();
+}
+
 bool MessageWriter::writeError(uint32_t serial, uint32_t replySerial, std::string_view errorName,
                                std::string_view text, std::string_view destination, std::string_view sender) {
   begin(wire::MessageType::error, wire::kNoReplyExpected, serial);

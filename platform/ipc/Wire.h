@@ -52,6 +52,7 @@ inline constexpr std::string_view kPropertiesInterface = "org.freedesktop.DBus.P
 
 inline constexpr std::string_view kErrorFailed = "org.freedesktop.DBus.Error.Failed";
 inline constexpr std::string_view kErrorAccessDenied = "org.freedesktop.DBus.Error.AccessDenied";
+inline constexpr std::string_view kErrorLimitsExceeded = "org.freedesktop.DBus.Error.LimitsExceeded";
 inline constexpr std::string_view kErrorInvalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
 inline constexpr std::string_view kErrorUnknownMethod = "org.freedesktop.DBus.Error.UnknownMethod";
 inline constexpr std::string_view kErrorUnknownInterface = "org.freedesktop.DBus.Error.UnknownInterface";
