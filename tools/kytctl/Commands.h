@@ -54,6 +54,14 @@ struct ExplainOptions {
   bool json = false;
 };
 
+struct WatchOptions {
+  std::string user;  // a name or a number; empty: all
+  std::string client;
+  std::optional<uint16_t> category;
+  bool bodies = false;
+  bool json = false;
+};
+
 struct SimulateOptions {
   std::string bag, events;  // files
   uint32_t devices = 1000;
@@ -106,6 +114,8 @@ struct SimulateOptions {
 [[nodiscard]] int metricsCommand(const std::string& root, bool json);
 // Prints the level, or sets it first.
 [[nodiscard]] int logLevelCommand(const std::string& root, const std::string& level, bool json);
+// Prints events as they pass, until the daemon ends or this program is interrupted.
+[[nodiscard]] int watchCommand(const std::string& root, const WatchOptions& options);
 [[nodiscard]] int reloadCommand(const std::string& root, bool json);
 
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.

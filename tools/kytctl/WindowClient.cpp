@@ -11,6 +11,7 @@
 #include <span>
 
 #include "platform/base/Paths.h"
+#include "platform/ipc/AdministrationDispatcher.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/linux/base/Descriptors.h"
@@ -131,7 +132,11 @@ std::variant<Message, Error> WindowClient::call(std::string_view member,
                                .signature = argument ? std::string_view("s") : std::string_view()});
   if (argument) writer.writeString(*argument);
   if (!writer.end()) return failure("the question is too long");
-  if (auto error = send(bytes)) return std::move(*error);
+  return answerTo(bytes);
+}
+
+std::variant<Message, Error> WindowClient::answerTo(const std::string& question) {
+  if (auto error = send(question)) return std::move(*error);
   for (;;) {
     auto message = next();
     const auto* answer = std::get_if<Message>(&message);
@@ -190,6 +195,34 @@ std::optional<Error> WindowClient::tell(std::string_view member, std::string_vie
   auto answer = call(member, argument);
   if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
   return std::nullopt;
+}
+
+std::optional<Error> WindowClient::watch(const Dictionary& filter) {
+  std::string bytes;
+  MessageWriter writer(bytes);
+  writer.beginCall(++serial_,
+                   {.interface = wire::kAdministrationInterface, .member = "Watch", .signature = "a{sv}"});
+  writer.writeDictionary(filter);
+  if (!writer.end()) return failure("the question is too long");
+  auto answer = answerTo(bytes);
+  if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
+  constexpr timeval kForEver{0, 0};
+  ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &kForEver, sizeof kForEver);
+  return std::nullopt;
+}
+
+std::variant<Dictionary, Error> WindowClient::nextPassed() {
+  for (;;) {
+    auto message = next();
+    if (auto* error = std::get_if<Error>(&message)) return std::move(*error);
+    const auto& signal = std::get<Message>(message);
+    if (signal.type != wire::MessageType::signal || signal.member != kPassedSignal) continue;
+    BodyReader in(signal);
+    Dictionary passed;
+    if (in.hasSignature(kPassedSignature)) in.readDictionary(passed);
+    if (in.finish() != BodyStatus::ok) return failure("the daemon's signal is of another form");
+    return passed;
+  }
 }
 
 }  // namespace kyt::tools

@@ -30,6 +30,10 @@ class WindowClient {
   // With one text as argument, without an answer but that it was done.
   [[nodiscard]] std::optional<Error> tell(std::string_view member, std::string_view argument);
 
+  // Lets the daemon tell of events from now on; nextPassed() then waits for each, for ever.
+  [[nodiscard]] std::optional<Error> watch(const Dictionary& filter);
+  [[nodiscard]] std::variant<Dictionary, Error> nextPassed();
+
  private:
   explicit WindowClient(Descriptor socket) : socket_(std::move(socket)) {}
   [[nodiscard]] std::optional<Error> shakeHands();
@@ -39,6 +43,7 @@ class WindowClient {
   [[nodiscard]] std::variant<Message, Error> next();
   [[nodiscard]] std::variant<Message, Error> call(std::string_view member,
                                                   const std::optional<std::string_view>& argument);
+  [[nodiscard]] std::variant<Message, Error> answerTo(const std::string& question);
 
   Descriptor socket_;
   std::string received_;

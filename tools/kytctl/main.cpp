@@ -25,6 +25,7 @@ struct Arguments {
   CheckOptions check;
   ExplainOptions explain;
   SimulateOptions simulate;
+  WatchOptions watch;
   std::string script, domain, key, value, type = "string", folder, document, publicKey;
   unsigned bits = 2048;
   std::string level;
@@ -230,6 +231,13 @@ void addWindow(const Command& program, Arguments& a) {
     command.flag("--json", a.json, "Print one JSON object");
     command.runs([&a, run = run] { a.status = run(a.connection.root, a.json); });
   }
+  const Command watch = program.command("watch", "Print events as they pass, with their fate");
+  watch.option("--user", a.watch.user, "Of this user's programs alone, by name or number");
+  watch.option("--client", a.watch.client, "Of clients of this name alone");
+  watch.option("--category", a.watch.category, "Of this category alone");
+  watch.flag("--bodies", a.watch.bodies, "Print the body of each request too, as it left");
+  watch.flag("--json", a.watch.json, "Print one JSON object a line");
+  watch.runs([&a] { a.status = watchCommand(a.connection.root, a.watch); });
   const Command level =
       program.command("log-level", "Print or set from which level on the running daemon logs lines");
   level.option("level", a.level, "The new level, until the daemon ends").oneOf({"debug", "default", "error"});

@@ -78,8 +78,13 @@ complete -c kytctl -n __kytctl_at -a storebags -d 'Which storebags are in force'
 complete -c kytctl -n __kytctl_at -a metrics -d 'Figures in the OpenMetrics text format'
 complete -c kytctl -n __kytctl_at -a log-level -d 'What the running daemon logs'
 complete -c kytctl -n __kytctl_at -a reload -d 'Let the running daemon take up settings'
+complete -c kytctl -n __kytctl_at -a watch -d 'Events as they pass'
+complete -c kytctl -n '__kytctl_at -b watch' -l user -x -a '(__fish_complete_users)' -d 'Of the programs of this user'
+complete -c kytctl -n '__kytctl_at -b watch' -l client -x -d 'Of clients of this name'
+complete -c kytctl -n '__kytctl_at -b watch' -l category -x -d 'Of this category'
+complete -c kytctl -n '__kytctl_at -b watch' -l bodies -d 'Print bodies too'
 complete -c kytctl -n '__kytctl_at log-level' -a 'debug default error'
-for command in status sessions books storebags metrics log-level reload
+for command in status sessions books storebags metrics log-level reload watch
     complete -c kytctl -n "__kytctl_at -b $command" -l json -d 'Print JSON'
 end
 complete -c kytctl -n '__kytctl_at defaults' -a 'read write delete'

@@ -1,0 +1,134 @@
+// kytctl watch: events as they pass, a line each, with what became of them.
+#include <pwd.h>
+
+#include <charconv>
+#include <cstdint>
+#include <cstdio>
+#include <string>
+#include <string_view>
+
+#include "platform/base/ReportingProgram.h"
+#include "platform/base/TextEscape.h"
+#include "platform/linux/data/RapidJSON.h"
+#include "tools/kytctl/Columns.h"
+#include "tools/kytctl/Commands.h"
+#include "tools/kytctl/StatusText.h"
+#include "tools/kytctl/WindowClient.h"
+
+namespace kyt::tools {
+
+namespace {
+
+constexpr int kNotRunning = 3;
+constexpr size_t kFateAt = 69;  // characters before the fate
+
+int refused(const Error& error) {
+  failed(error);
+  return error.code == WindowClient::kNoDaemon ? kNotRunning : 1;
+}
+
+std::optional<uint32_t> userOf(const std::string& text) {
+  uint32_t number = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
+  if (error == std::errc() && end == text.data() + text.size()) return number;
+  const passwd* account = ::getpwnam(text.c_str());
+  return account != nullptr ? std::optional<uint32_t>(account->pw_uid) : std::nullopt;
+}
+
+size_t charactersIn(std::string_view text) {
+  size_t count = 0;
+  for (const char c : text) count += (static_cast<unsigned char>(c) & 0xC0) != 0x80 ? 1 : 0;
+  return count;
+}
+
+std::string field(std::string_view text, size_t width, bool right = false) {
+  std::string shown = cutText(text, width);
+  const std::string blanks(width - charactersIn(shown), ' ');
+  return (right ? blanks + shown : shown + blanks) + "  ";
+}
+
+std::string numberOr(const Dictionary& event, const char* key) {
+  return event.find(key) != nullptr ? std::to_string(numberIn(event, key)) : "-";
+}
+
+std::string line(const std::string& time, const std::string& user, const std::string& family,
+                 const std::string& names, const std::string& backEnd, const std::string& kind,
+                 const std::string& fate) {
+  return field(time, 8) + field(user, 7, true) + field(family, 4) + field(names, 19) + field(backEnd, 9) +
+         field(kind, 11) + cutText(fate, kMostCharacters - kFateAt - 1) + "\n";
+}
+
+std::string eventLine(const Dictionary& event) {
+  const std::string rule = textIn(event, "rule");
+  const int64_t time = numberIn(event, "time"), status = numberIn(event, "status");
+  std::string fate = textIn(event, "fate");
+  if (!rule.empty()) fate += " by " + rule;
+  if (status != 0) fate += ": " + std::to_string(status);
+  const bool internal = event.boolean("internal");
+  return line(clockText(time, time), std::to_string(numberIn(event, "user")), textIn(event, "family"),
+              internal ? "(start and stop)" : textIn(event, "client") + ":" + textIn(event, "service"),
+              textIn(event, "backEnd"), numberOr(event, "category") + "/" + numberOr(event, "type"), fate);
+}
+
+// In lines of whole characters.
+std::string bodyLines(const Dictionary& event) {
+  const std::string body = textIn(event, "body");
+  const auto bytes = static_cast<uint64_t>(numberIn(event, "bodyBytes"));
+  std::string lines = "    post " + std::to_string(numberIn(event, "post")) + " to " +
+                      cutText(textIn(event, "server"), 48) + ", " + bytesText(bytes) +
+                      (body.empty()           ? ", not kept"
+                       : body.size() != bytes ? ", of which the beginning:"
+                                              : ":") +
+                      "\n";
+  const std::string shown = escapedText(body);
+  for (std::string_view rest = shown; !rest.empty();) {
+    const std::string_view piece = cutUTF8(rest, kMostCharacters - 4);
+    lines.append("    ").append(piece).append("\n");
+    rest.remove_prefix(piece.size());
+  }
+  return lines;
+}
+
+void print(const Dictionary& event, bool json) {
+  std::string text;
+  if (json) {
+    RapidJSON().writeCompact(event, text);
+    text += '\n';
+  } else {
+    if (const int64_t lost = numberIn(event, "lost"); lost != 0)
+      text = "    " + std::to_string(lost) + " were not told: more passed than was read here\n";
+    text += eventLine(event);
+    if (event.find("bodyBytes") != nullptr) text += bodyLines(event);
+  }
+  std::fputs(text.c_str(), stdout);
+  std::fflush(stdout);
+}
+
+}  // namespace
+
+int watchCommand(const std::string& root, const WatchOptions& options) {
+  Dictionary filter;
+  if (!options.user.empty()) {
+    const std::optional<uint32_t> user = userOf(options.user);
+    if (!user) return failed("There is no user " + options.user);
+    filter.set("user", *user);
+  }
+  if (!options.client.empty()) filter.set("client", options.client);
+  if (options.category) filter.set("category", *options.category);
+  if (options.bodies) filter.set("bodies", true);
+  auto client = WindowClient::connect(root);
+  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  auto& window = std::get<WindowClient>(client);
+  if (const auto error = window.watch(filter)) return refused(*error);
+  if (!options.json) {
+    std::fputs(line("TIME", "USER", "TYPE", "CLIENT:SERVICE", "BACK END", "EVENT", "FATE").c_str(), stdout);
+    std::fflush(stdout);
+  }
+  for (;;) {
+    auto passed = window.nextPassed();
+    if (const auto* error = std::get_if<Error>(&passed)) return refused(*error);
+    print(std::get<Dictionary>(passed), options.json);
+  }
+}
+
+}  // namespace kyt::tools
