@@ -20,7 +20,7 @@ namespace kyt::tools {
 namespace {
 
 constexpr int kNotRunning = 3;
-constexpr size_t kFateAt = 69;  // characters before the fate
+constexpr size_t kFateAt = 58;  // characters before the fate
 
 int refused(const Error& error) {
   failed(error);
@@ -51,22 +51,21 @@ std::string numberOr(const Dictionary& event, const char* key) {
   return event.find(key) != nullptr ? std::to_string(numberIn(event, key)) : "-";
 }
 
-std::string line(const std::string& time, const std::string& user, const std::string& family,
-                 const std::string& names, const std::string& backEnd, const std::string& kind,
-                 const std::string& fate) {
-  return field(time, 8) + field(user, 7, true) + field(family, 4) + field(names, 19) + field(backEnd, 9) +
-         field(kind, 11) + cutText(fate, kMostCharacters - kFateAt - 1) + "\n";
+std::string line(const std::string& time, const std::string& user, const std::string& names,
+                 const std::string& backEnd, const std::string& kind, const std::string& fate) {
+  return field(time, 8) + field(user, 7, true) + field(names, 14) + field(backEnd, 8) + field(kind, 11) +
+         cutText(fate, kMostCharacters - kFateAt) + "\n";
 }
 
 std::string eventLine(const Dictionary& event) {
   const std::string rule = textIn(event, "rule");
   const int64_t time = numberIn(event, "time"), status = numberIn(event, "status");
   std::string fate = textIn(event, "fate");
-  if (!rule.empty()) fate += " by " + rule;
+  if (!rule.empty()) fate += ": " + rule;
   if (status != 0) fate += ": " + std::to_string(status);
   const bool internal = event.boolean("internal");
-  return line(clockText(time, time), std::to_string(numberIn(event, "user")), textIn(event, "family"),
-              internal ? "(start and stop)" : textIn(event, "client") + ":" + textIn(event, "service"),
+  return line(clockText(time, time), std::to_string(numberIn(event, "user")),
+              internal ? "(start, stop)" : textIn(event, "client") + ":" + textIn(event, "service"),
               textIn(event, "backEnd"), numberOr(event, "category") + "/" + numberOr(event, "type"), fate);
 }
 
@@ -121,7 +120,7 @@ int watchCommand(const std::string& root, const WatchOptions& options) {
   auto& window = std::get<WindowClient>(client);
   if (const auto error = window.watch(filter)) return refused(*error);
   if (!options.json) {
-    std::fputs(line("TIME", "USER", "TYPE", "CLIENT:SERVICE", "BACK END", "EVENT", "FATE").c_str(), stdout);
+    std::fputs(line("TIME", "USER", "CLIENT:SERVICE", "BACK END", "EVENT", "FATE").c_str(), stdout);
     std::fflush(stdout);
   }
   for (;;) {
