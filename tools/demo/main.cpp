@@ -86,6 +86,8 @@ void printCommands(Stage& stage) {
   std::printf(
       "\nTwo clients go on reporting until Ctrl-C, which ends all of it. See them come in at %s/ , and try:\n\n",
       stage.httpBase().c_str());
+  std::printf("  %s status\n", kytctl.c_str());
+  std::printf("  %s watch --bodies       # events as they pass\n", kytctl.c_str());
   std::printf("  %s owner show\n", kytctl.c_str());
   std::printf("  %s consent withdraw     # counts for sessions that begin from then on\n", kytctl.c_str());
   std::printf(
