@@ -2,6 +2,7 @@
 // JSON for programs, of the same daemon.
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <map>
 #include <regex>
 #include <set>
@@ -102,9 +103,9 @@ TEST_F(KytctlWindow, TellsHowTheDaemonStandsInBothForms) {
 
   const std::string shown = columns({"status"});
   for (const char* line :
-       {"\nclients        1 sessions, 1 connections\n", "\nlast hour      1 delivered, 0 dropped (0.0 %)\n",
+       {"\nclients        1 session, 1 connection\n", "\nlast hour      1 delivered, 0 dropped (0.0 %)\n",
         "\nall            1 delivered, 0 dropped (0.0 %), 1 pending of 2 taken\n",
-        "\nback ends      QH httppost enabled, in 1 sessions\n", "storebags      cadmor version 1 in force"})
+        "\nback ends      QH httppost enabled, in 1 session\n", "storebags      cadmor version 1 in force"})
     EXPECT_NE(shown.find(line), std::string::npos) << shown;
 
   const std::vector<Dictionary> sessions = rows(json({"sessions"}), "sessions");
@@ -156,7 +157,7 @@ TEST_F(KytctlWindow, TellsWhatIsLostAndWhichRuleKeepsABackEndOff) {
   EXPECT_TRUE(broken.send(5, 1, {}));
   EXPECT_EQ(broken.flush(), "flushed");
   const std::string shown = columns({"status"});
-  EXPECT_NE(shown.find("QH httppost disabled by client, in 1 sessions"), std::string::npos) << shown;
+  EXPECT_NE(shown.find("QH httppost disabled by client, in 1 session"), std::string::npos) << shown;
   EXPECT_NE(shown.find(" 1 event-dropped-by-state\n"), std::string::npos) << shown;
   EXPECT_NE(shown.find(" 1 post-refused\n"), std::string::npos) << shown;
   EXPECT_NE(shown.find("last error at "), std::string::npos) << shown;
@@ -239,6 +240,19 @@ TEST_F(KytctlWindow, SaysThatTheDaemonDoesNotRunAndWhetherASocketWaits) {
   const ProgramRun run = runProgram(program, {"--root", daemon.root().path(), "status", "--json"});
   EXPECT_EQ(run.status, 3);
   EXPECT_EQ(run.text, "kytctl: the daemon does not run; its socket waits for the first client\n");
+}
+
+TEST_F(KytctlWindow, SaysThatTheDaemonRunsWithoutItsAdministrationSocket) {
+  DaemonProcess daemon("http://127.0.0.1:9");
+  ASSERT_TRUE(daemon.startAndWait()) << daemon.log();
+  std::filesystem::remove(daemon.root() / "run/kytreportingd/admin");
+  const ProgramRun run =
+      runProgram(std::string(KYT_PROGRAMS) + "/kytctl", {"--root", daemon.root().path(), "status"});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_NE(run.text.find("the daemon runs, as process " + std::to_string(daemon.process()) +
+                          ", and has no administration socket"),
+            std::string::npos)
+      << run.text;
 }
 
 }  // namespace

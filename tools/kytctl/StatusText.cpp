@@ -20,6 +20,11 @@ void addLine(std::string& out, const std::string& label, const std::string& text
   out += padded + cutText(text, kMostCharacters - kLabel) + "\n";
 }
 
+// "1 session", "2 sessions".
+std::string countText(int64_t count, const char* what) {
+  return std::to_string(count) + " " + what + (count == 1 ? "" : "s");
+}
+
 std::string percent(int64_t part, int64_t whole) {
   if (whole <= 0) return "";
   char text[16];
@@ -63,7 +68,7 @@ void addBackEnds(std::string& out, const Dictionary& status, int64_t now) {
     addLine(out, std::exchange(label, ""),
             textIn(*backEnd, "family") + " " + textIn(*backEnd, "name") + " " + textIn(*backEnd, "state") +
                 (rule.empty() ? "" : " by " + rule) + ", in " +
-                std::to_string(numberIn(*backEnd, "sessions")) + " sessions");
+                countText(numberIn(*backEnd, "sessions"), "session"));
   }
 }
 
@@ -126,8 +131,8 @@ std::string statusText(const Dictionary& status, const std::vector<Dictionary>& 
           bytesText(static_cast<uint64_t>(numberIn(status, "memoryBytes"))) + ", " +
               std::to_string(numberIn(status, "threads")) + " threads");
   addLine(out, "clients",
-          std::to_string(numberIn(status, "sessions")) + " sessions, " +
-              std::to_string(numberIn(status, "connections")) + " connections");
+          countText(numberIn(status, "sessions"), "session") + ", " +
+              countText(numberIn(status, "connections"), "connection"));
   if (const Dictionary* lastHour = status.dictionary("lastHour")) {
     addFates(out, "last hour", *lastHour, "");
     addReasons(out, *lastHour);

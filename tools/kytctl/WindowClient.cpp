@@ -15,6 +15,7 @@
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/linux/base/Descriptors.h"
+#include "platform/linux/device/DepartureFile.h"
 
 namespace kyt::tools {
 
@@ -40,6 +41,9 @@ bool isListeningAt(const std::string& path) {
 }
 
 Error noDaemon(const Paths& paths) {
+  if (const pid_t daemon = DaemonLock::holder(paths.userDefaults()); daemon > 0)
+    return failure("the daemon runs, as process " + std::to_string(daemon) +
+                   ", and has no administration socket at " + paths.administration());
   return failure(isListeningAt(paths.socket())
                      ? "the daemon does not run; its socket waits for the first client"
                      : "the daemon does not run, and no socket waits for clients at " + paths.socket(),
