@@ -39,7 +39,8 @@ struct AdministrationSources {
   const StorebagStandings& storebags;
   const ServerRecords& servers;
   std::string version;
-  int64_t since = 0;  // seconds since 1970
+  int64_t since = 0;       // seconds since 1970
+  bool hasOutbox = false;  // the settings want one
   // Any thread.
   std::function<size_t()> connections;
   std::function<ProcessFigures()> process;

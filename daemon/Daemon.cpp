@@ -40,9 +40,12 @@ constexpr int kNotConfined = -1;
 constexpr Duration kErasurePatience = std::chrono::seconds(10);
 constexpr uint32_t kPublicFolder = 0755;   // clients look the socket up in it
 constexpr uint32_t kPrivateFolder = 0750;  // identifiers, and what was sent
+constexpr uint32_t kSecretFolder = 0700;   // what is to be sent
 
 // The folders that the daemon writes to, which the confinement names, so they must exist before it.
-std::optional<std::string> makeMissingFolders(const Paths& paths) {
+std::optional<std::string> makeMissingFolders(const Paths& paths, const Settings& settings) {
+  if (settings.outbox.enabled)
+    if (auto error = makeFolders(paths.outbox(), kSecretFolder)) return error;
   if (auto error = makeFolders(paths.run(), kPublicFolder)) return error;
   return makeFolders(paths.userDefaults(), kPrivateFolder);
 }
@@ -64,6 +67,7 @@ LinuxConfinement confinementOf(const Paths& paths, const std::string& config, co
                            {"SHARE", paths.kytShare()},
                            {"PLUGINS", paths.plugIns()},
                            {"STATE", paths.userDefaults()},
+                           {"OUTBOX", settings.outbox.enabled ? paths.outbox() : ""},
                            {"LOGS", logs},
                            {"RUN", paths.run()},
                            {"CA", settings.caFile.empty() ? "" : folderOf(settings.caFile)}});
@@ -250,7 +254,7 @@ int runDaemon(const DaemonOptions& options) {
   Counters counters;
   const std::unique_ptr<LogSink> sink = makeLogSink(settings.logTarget, counters);
   log.setSink(*sink);
-  if (auto error = makeMissingFolders(paths)) {
+  if (auto error = makeMissingFolders(paths, settings)) {
     log.error("main: %s", error->c_str());
     return kCouldNotStart;
   }

@@ -130,8 +130,9 @@ void checkProfile(const Paths& paths, Problems& problems) {
   const std::string path = paths.kytShare() + "/" + kServiceName + ".profile";
   const auto text = readTomlText(path);
   if (const auto* error = std::get_if<TomlError>(&text)) return problems.push_back(error->text);
-  const ProfileVariables variables = {{"CONFIG", "/"}, {"SETTINGS", "/"}, {"SHARE", "/"}, {"PLUGINS", "/"},
-                                      {"STATE", "/"},  {"LOGS", "/"},     {"RUN", "/"},   {"CA", "/"}};
+  const ProfileVariables variables = {{"CONFIG", "/"},  {"SETTINGS", "/"}, {"SHARE", "/"},
+                                      {"PLUGINS", "/"}, {"STATE", "/"},    {"OUTBOX", "/"},
+                                      {"LOGS", "/"},    {"RUN", "/"},      {"CA", "/"}};
   const auto profile = parseProfile(std::get<std::string>(text), path, variables);
   if (const auto* error = std::get_if<TomlError>(&profile)) problems.push_back(error->text);
 }

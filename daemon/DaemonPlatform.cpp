@@ -66,12 +66,18 @@ DaemonPlatform::DaemonPlatform(Start start)
       clientBundle(start.paths.clientBundle(), start.log),
       daemonBundle(start.paths.daemonBundle(), start.log),
       entitlements(entitlementsOptions(start.paths), start.inspector, start.log, start.counters, clock),
-      urlSessions(urlSessionOptions(start.settings, servers), start.log, start.counters),
+      departures(start.paths.userDefaults(), json, start.log, clock, *reactor,
+                 SerialQueue::create("kyt.departures", workers)),
+      network(urlSessionOptions(start.settings, servers), start.log, start.counters),
+      outbox(start.settings.outbox.enabled
+                 ? std::make_unique<DaemonOutbox>(DaemonOutbox::Ports{
+                       start.settings.outbox, start.paths.outbox(), clock, *reactor, random, consent,
+                       start.counters, start.log, books, departures, network})
+                 : nullptr),
+      urlSessions(outbox ? outbox->sessions() : network),
       fileExtensions(start.broker, start.log, start.counters, budget),
       pluginBundles(start.paths.root, start.log),
       powerLog(start.counters),
-      departures(start.paths.userDefaults(), json, start.log, clock, *reactor,
-                 SerialQueue::create("kyt.departures", workers)),
       ports{
           .limits = start.settings.limits,
           .counters = start.counters,
@@ -104,7 +110,7 @@ DaemonPlatform::DaemonPlatform(Start start)
 void DaemonPlatform::takeUp(const Settings& settings) {
   const UserShares shares = UserShares::of(settings.limits, memoryForUsers, descriptorsForUsers);
   for (const ShareRow& row : kShareRows) budget.shares()[row.share] = shares[row.share];
-  urlSessions.reconfigure({settings.caFile, settings.cellularInterfaces});
+  network.reconfigure({settings.caFile, settings.cellularInterfaces});
 }
 
 }  // namespace kyt

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <memory>
 
+#include "daemon/DaemonOutbox.h"
 #include "platform/Deflate.h"
 #include "platform/Platform.h"
 #include "platform/base/Books.h"
@@ -79,13 +80,15 @@ struct DaemonPlatform {
   DefaultsDiagnosticsConsent consent;
   TomlBundle clientBundle, daemonBundle;
   TomlEntitlements entitlements;
-  CurlURLSessionFactory urlSessions;
+  DepartureFile departures;
+  CurlURLSessionFactory network;
+  const std::unique_ptr<DaemonOutbox> outbox;  // null: the settings want none
+  URLSessionFactory& urlSessions;              // the network's, or those of the outbox before it
   LinuxUDPSocketFactory udpSockets;
   LinuxFileExtensions fileExtensions;
   DlopenPluginBundles pluginBundles;
   JournalPowerLog powerLog;
   LinuxFileManager files;
-  DepartureFile departures;
   Platform ports;
 };
 

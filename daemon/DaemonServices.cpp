@@ -109,6 +109,7 @@ AdministrationSources DaemonServices::administrationSources(std::string version,
           .servers = system_.servers,
           .version = std::move(version),
           .since = system_.clock.timeOfDay().seconds,
+          .hasOutbox = system_.outbox != nullptr,
           .connections = [this] { return listener_.connectionCount(); },
           .process =
               [] {
@@ -129,6 +130,7 @@ DaemonServices::~DaemonServices() = default;
 void DaemonServices::resume() {
   listener_.resume();
   if (windows_) windows_->resume();
+  if (system_.outbox) system_.outbox->outbox().begin();
   resumed_ = true;
   if (const auto interval = Watchdog::requestedInterval())
     watchdog_.emplace(*interval, *system_.reactor, system_.workers, &ServiceManager::alive);
@@ -139,10 +141,13 @@ bool DaemonServices::isOutstanding() const {
   return system_.urlSessions.outstanding() != 0 || system_.udpSockets.openSockets() != 0;
 }
 
-// The idle time counts anew from the end of what a session left behind. A connection may be on its way to becoming a
+// The idle time counts anew from the end of what a session left behind; what could not be sent is to be sent when that is
+// possible again. A connection may be on its way to becoming a
 // session, and before the start is over nothing here may be looked at.
 bool DaemonServices::isIdle() const {
-  return resumed_ && listener_.connectionCount() == 0 && agent_.sessionCount() == 0 && !isOutstanding();
+  const bool isAllSent = !system_.outbox || system_.outbox->outbox().isEmpty();
+  return resumed_ && listener_.connectionCount() == 0 && agent_.sessionCount() == 0 && !isOutstanding() &&
+         isAllSent;
 }
 
 // The end of accepting comes before the decision is final: who connects from then on waits in the socket's line for the
@@ -167,6 +172,7 @@ bool DaemonServices::shutDown() {
   // Downloads and uploads end in their error paths, and none begins: before anything that needs the agent's
   // monitor, which a download holds, and so that no session's end waits behind its own upload.
   system_.urlSessions.cancelAwaited();
+  if (system_.outbox) system_.outbox->outbox().stopSending();
   endSessions(deadline);
   waitForRequests(deadline);
   if (!deadline.waitUntil([this] { return listener_.connectionCount() == 0; }))
@@ -176,7 +182,9 @@ bool DaemonServices::shutDown() {
   // large batch one that writes and compresses it.
   const bool workersEnd = system_.workers.shutDownWithin(deadline.left() + kCancelGrace);
   // Completions write to the message log and more that is destroyed before the URL sessions are.
-  const bool threadsEnd = system_.urlSessions.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
+  bool threadsEnd = system_.network.shutDownWithin(deadline.left() + kCancelGrace) && workersEnd;
+  if (system_.outbox)
+    threadsEnd = system_.outbox->shutDownWithin(deadline.left() + kCancelGrace) && threadsEnd;
   if (threadsEnd)
     system_.reactor->stop();
   else

@@ -52,6 +52,10 @@ struct URLRequest {
   // come from the same device, those of two never, unless they go through one URL session. Empty: none.
   std::string identity;
   std::shared_ptr<const BookedEvents> events;  // what is told when it begins and ceases to wait; null: nobody
+  // Its body exists only since the owner consents: what keeps the request forgets it with the consent.
+  bool isByConsent = false;
+  // Without a network it fails at once, although the session waits for one.
+  bool neverWaits = false;
 };
 
 // What a request counts towards what is outstanding, in bytes: header lines, body, and what keeping any request costs.
@@ -127,6 +131,9 @@ class URLSessionFactory {
   [[nodiscard]] virtual URLFigures figures() const = 0;
   // Requests not completed yet; the daemon's shut-down waits for zero.
   [[nodiscard]] virtual size_t outstanding() const = 0;
+  // From the next request on `changed` runs a moment after each change of the kernel's routes and addresses; null: no more.
+  // On the network thread: it must not block. Any thread.
+  virtual void watchConnectivity(std::shared_ptr<Function<void()>> changed) = 0;
 };
 
 }  // namespace kyt

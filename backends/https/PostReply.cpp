@@ -59,7 +59,8 @@ void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> respo
 void PostReply::tellOwner(const std::optional<URLResponse>& response,
                           const std::optional<Error>& error) const {
   const std::shared_ptr<const BookedEvents> posted = events.events();
-  if (posted == nullptr || !mayHaveLeft(response, error)) return;
+  if (posted == nullptr || posted->areKept() || !mayHaveLeft(response, error))
+    return;  // the outbox tells of its own
   for (const auto& [program, count] : posted->programs())
     platform.departures.add({.program = program,
                              .server = std::string(serverOf(address)),

@@ -178,6 +178,7 @@ URLRequest PostRequest::request(const String& url, std::string json,
   request.body = std::move(*body);
   request.allowsCellularAccess = !facts_.shouldUseWiFiOnly;
   request.account = facts_.account;
+  request.isByConsent = facts_.consentShowsText;  // the same condition
   if (facts_.clientID) request.identity = facts_.clientID->str();
   return request;
 }

@@ -23,7 +23,8 @@ struct PostFacts {
   SharedSessionFacts session;
   std::optional<String> clientID;
   std::optional<String> clientName, serviceName;
-  // The pretty text may be shown: by the user's consent, or by a setting of the device, in some environments.
+  // The pretty text may be shown: by the user's consent (by which alone the events were collected), or by a setting of the
+  // device, in some environments.
   bool consentShowsText = false, settingShowsText = false;
   bool shouldUseWiFiOnly = false;
   std::optional<Data> digestKey;

@@ -44,6 +44,8 @@ struct Books::Row {
   bool isInternal = false;  // constant once there is a tally
   Number postsBegun{0}, postsEnded{0};
   Number waitsBegun{0}, waitsEnded{0};
+  Number outboxEntered{0}, outboxLeft{0};
+  Number restored{0};  // taken by an earlier process
   Number batchesLeft{0};
   Number delivered{0};
   std::array<Number, kFates.size()> dropped{};
@@ -52,6 +54,7 @@ struct Books::Row {
   Tally* first = nullptr;
   uint64_t taken = 0, batched = 0;  // of tallies that are gone
   uint64_t programsMerged = 0;
+  const BookRowName* name = nullptr;  // constant
 
   void fill(BookRow& row) const;
 };
@@ -61,12 +64,7 @@ struct Books::State {
   const Clock* const clock;
   RecentFates recent;
 
-  struct Key {
-    ReportingProgram program;
-    std::string backEnd;
-    bool isInternal = false, isOther = false;
-    friend auto operator<=>(const Key&, const Key&) = default;
-  };
+  using Key = BookRowName;
 
   mutable Mutex mutex;
   std::map<Key, Row> rows GUARDED_BY(mutex);
@@ -83,6 +81,8 @@ struct Books::State {
 void Books::Row::fill(BookRow& row) const {
   row.delivered = read(delivered);
   for (size_t i = 0; i < kFates.size(); ++i) row.dropped[i] = read(dropped[i]);
+  const uint64_t leftOutbox = read(outboxLeft);
+  row.outbox = read(outboxEntered) - leftOutbox;
   const uint64_t ended = read(postsEnded);
   const uint64_t noLongerWaiting = read(waitsEnded);
   const uint64_t begunToWait = read(waitsBegun);
@@ -94,9 +94,9 @@ void Books::Row::fill(BookRow& row) const {
   uint64_t entered = batched;
   for (const Tally* tally = first; tally != nullptr; tally = tally->next_) entered += read(tally->batched_);
   row.batched = entered - left;
-  row.taken = taken;
+  row.taken = taken + read(restored);
   for (const Tally* tally = first; tally != nullptr; tally = tally->next_) row.taken += read(tally->taken_);
-  row.queued = row.taken - row.batched - posted - row.delivered - row.droppedInAll();
+  row.queued = row.taken - row.batched - posted - row.outbox - row.delivered - row.droppedInAll();
   row.programsMerged = programsMerged;
 }
 
@@ -109,9 +109,10 @@ Books::Row& Books::State::row(Key key) {
   ++rowsOfPrograms;
   ++ofUser;
   const bool isInternal = key.isInternal;
-  Row& made = rows[std::move(key)];
-  made.isInternal = isInternal;
-  return made;
+  const auto made = rows.try_emplace(std::move(key)).first;
+  made->second.name = &made->first;
+  made->second.isInternal = isInternal;
+  return made->second;
 }
 
 Books::Row& Books::State::otherRow(const ReportingProgram& program) {
@@ -123,6 +124,7 @@ Books::Row& Books::State::otherRow(const ReportingProgram& program) {
     // The last one is for all users that come after.
     const bool isLast = rows.size() - rowsOfPrograms + 1 >= Limits::bookRowsForOthers;
     found = rows.try_emplace(keyOf(isLast ? kAllUsers : program.user)).first;
+    found->second.name = &found->first;
   }
   if (merged.size() < kMostMerged && merged.insert(hashOf(program)).second) ++found->second.programsMerged;
   found->second.programsMerged = std::max<uint64_t>(found->second.programsMerged, 1);
@@ -142,6 +144,13 @@ std::shared_ptr<Tally> Books::open(const ReportingProgram& program, std::string_
                  false};
   MutexLock lock(state_->mutex);
   return std::make_shared<Tally>(state_, state_->row(std::move(key)), program);
+}
+
+std::shared_ptr<Tally> Books::reopen(BookRowName name) {
+  const ReportingProgram program = name.program;
+  MutexLock lock(state_->mutex);
+  Row& row = name.isOther ? state_->otherRow(program) : state_->row(std::move(name));
+  return std::make_shared<Tally>(state_, row, program);
 }
 
 std::vector<BookRow> Books::snapshot() const {
@@ -191,6 +200,19 @@ void Tally::beginWaiting(size_t events) {
 }
 void Tally::endWaiting(size_t events) {
   add(row_.waitsEnded, events);
+}
+void Tally::enterOutbox(size_t events) {
+  add(row_.outboxEntered, events);
+}
+void Tally::leaveOutbox(size_t events) {
+  add(row_.outboxLeft, events);
+}
+void Tally::restore(size_t events) {
+  add(row_.restored, events);
+  add(row_.outboxEntered, events);
+}
+const BookRowName& Tally::rowName() const {
+  return *row_.name;
 }
 void Tally::deliver(size_t events) {
   add(row_.delivered, events);
@@ -288,6 +310,28 @@ void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
   }
 }
 
+std::vector<BookedEvents::OfRow> BookedEvents::rows() const {
+  std::vector<OfRow> rows;
+  forEachRun([&rows](const Tally& tally, size_t events) {
+    const BookRowName& name = tally.rowName();
+    const auto known =
+        std::find_if(rows.begin(), rows.end(), [&name](const OfRow& row) { return row.row == name; });
+    if (known != rows.end())
+      known->events += events;
+    else
+      rows.push_back({name, events});
+  });
+  return rows;
+}
+
+void BookedEvents::keep() const {
+  forEachRun([](Tally& tally, size_t events) {
+    tally.endPost(events);
+    tally.enterOutbox(events);
+  });
+  areKept_ = true;
+}
+
 Tally* BookedEventsReader::next() {
   if (run_ == end_) return nullptr;
   Tally* tally = run_->tally.get();
@@ -308,6 +352,7 @@ PostedEvents::~PostedEvents() {
 }
 
 std::shared_ptr<const BookedEvents> PostedEvents::close() {
+  if (events_ && events_->areKept()) events_ = nullptr;
   if (events_) events_->endPost();
   return std::move(events_);
 }

@@ -33,6 +33,14 @@ namespace kyt {
 // The back end of events that none took.
 inline constexpr std::string_view kNoBackEnd = "-";
 
+// What names a row, for who keeps events longer than the process lives.
+struct BookRowName {
+  ReportingProgram program;
+  std::string backEnd;
+  bool isInternal = false, isOther = false;
+  friend auto operator<=>(const BookRowName&, const BookRowName&) = default;
+};
+
 struct BookRow {
   ReportingProgram program;
   std::string backEnd;      // "-": none took the event
@@ -42,7 +50,7 @@ struct BookRow {
   uint64_t batched = 0;   // in the batch of a back end
   uint64_t inFlight = 0;  // in a request that was not answered yet
   uint64_t waiting = 0;   // in one that waits for connectivity
-  uint64_t outbox = 0;    // kept to be sent again: there is no such place yet
+  uint64_t outbox = 0;    // in a post that is kept on disk, to be sent again
   uint64_t delivered = 0;
   std::array<uint64_t, kFates.size()> dropped{};
   // Not 0: this is the row "other" of a user, of so many programs (at least) that had no room for rows of their own.
@@ -71,6 +79,8 @@ class Books {
   // share the row "other" of their user. Names are cut to Limits::maxBookNameBytes. Takes a lock.
   [[nodiscard]] std::shared_ptr<Tally> open(const ReportingProgram& program, std::string_view backEnd,
                                             bool isInternal);
+  // The same by a name that a tally had, perhaps in an earlier process.
+  [[nodiscard]] std::shared_ptr<Tally> reopen(BookRowName name);
 
   // All rows, in the order of user, client type, names and back end. Waits for nobody but open() and ends of tallies.
   [[nodiscard]] std::vector<BookRow> snapshot() const;
@@ -111,8 +121,13 @@ class Tally final : public std::enable_shared_from_this<Tally> {
   void endPost(size_t events);
   void beginWaiting(size_t events);
   void endWaiting(size_t events);
+  void enterOutbox(size_t events);
+  void leaveOutbox(size_t events);
+  // Events that an earlier process took, and that lie in the outbox.
+  void restore(size_t events);
   void deliver(size_t events);
   void drop(Reason fate, size_t events);
+  [[nodiscard]] const BookRowName& rowName() const;
 
  private:
   friend class Books;
@@ -163,6 +178,17 @@ class BookedEvents {
   void deliver() const;
   void drop(Counters& counters, Reason fate) const;
 
+  // Of those that are booked: how many of which row.
+  struct OfRow {
+    BookRowName row;
+    uint64_t events = 0;
+  };
+  [[nodiscard]] std::vector<OfRow> rows() const;
+  // The outbox has them: their post has ended, and whoever posted them (PostedEvents) closes nothing any more. By whoever
+  // answers the post, before the answer.
+  void keep() const;
+  [[nodiscard]] bool areKept() const { return areKept_; }
+
  private:
   friend class BookedEventsReader;
   struct Run {
@@ -176,6 +202,7 @@ class BookedEvents {
   std::vector<Run> runs_;
   size_t size_ = 0;
   std::shared_ptr<const Shown> shown_;  // null: nobody is told
+  mutable bool areKept_ = false;
 };
 
 // The tally of each event, in order; null past the last.

@@ -106,6 +106,20 @@ const char* reasonName(Reason reason) {
       return "post-without-room";
     case Reason::postCancelled:
       return "post-cancelled";
+    case Reason::outboxDisplaced:
+      return "outbox-displaced";
+    case Reason::outboxTooOld:
+      return "outbox-too-old";
+    case Reason::outboxConsentWithdrawn:
+      return "outbox-consent-withdrawn";
+    case Reason::outboxDropped:
+      return "outbox-dropped";
+    case Reason::outboxUnreadable:
+      return "outbox-unreadable";
+    case Reason::postNotKept:
+      return "post-not-kept";
+    case Reason::outboxFileDamaged:
+      return "outbox-file-damaged";
     case Reason::requestFailed:
       return "request-failed";
     case Reason::requestRefused:

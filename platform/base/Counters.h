@@ -71,7 +71,15 @@ enum class Reason : uint8_t {
   postDisplaced,    // dropped for newer ones while it waited for connectivity
   postWithoutRoom,  // too much of its session or user was not answered yet
   postCancelled,    // cut off by the end of the daemon
-  requestFailed,    // the posts of events themselves
+  // Of what the outbox had kept.
+  outboxDisplaced,         // the oldest, for newer ones
+  outboxTooOld,            // not taken by its server in time
+  outboxConsentWithdrawn,  // collected by the owner's consent, which is no more
+  outboxDropped,           // by the administrator
+  outboxUnreadable,        // its file was damaged
+  postNotKept,  // a post that failed and that the outbox could not keep; its events are lost as without one
+  outboxFileDamaged,  // times that the outbox's file was set aside
+  requestFailed,      // the posts of events themselves
   requestRefused,
   requestRedirected,
   waitingRequestDisplaced,   // a request dropped while waiting for connectivity
@@ -121,6 +129,11 @@ inline constexpr std::array kFates = {
     Reason::postDisplaced,
     Reason::postWithoutRoom,
     Reason::postCancelled,
+    Reason::outboxDisplaced,
+    Reason::outboxTooOld,
+    Reason::outboxConsentWithdrawn,
+    Reason::outboxDropped,
+    Reason::outboxUnreadable,
 };
 // Its place in kFates; kFates.size() for what is none.
 [[nodiscard]] constexpr size_t fateNumber(Reason reason) {

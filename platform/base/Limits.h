@@ -96,6 +96,11 @@ struct Limits {
   static constexpr size_t maxWatchedBodies = 4u
                                              << 20;  // bytes, for all watchers; further bodies are left out
   static constexpr std::chrono::milliseconds watchPeriod{100};  // between looks at what waits for a watcher
+  // Of the outbox, besides what is set: posts, since each takes 40 bytes of memory; bytes that wait for a slow disk;
+  // bytes that are sent again at a time (one post to each server goes in any case).
+  static constexpr size_t maxOutboxPosts = 131072;
+  static constexpr size_t maxBytesOnTheWayToTheOutbox = 8u << 20;
+  static constexpr size_t maxOutboxBytesInFlight = 4u << 20;
 };
 
 }  // namespace kyt

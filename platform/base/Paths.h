@@ -21,6 +21,7 @@ struct Paths {
   [[nodiscard]] std::string entitlements() const { return configuration() + "/entitlements.d"; }
   [[nodiscard]] std::string device() const { return configuration() + "/device.toml"; }
   [[nodiscard]] std::string userDefaults() const { return root + "/var/lib/kytreportingd/defaults"; }
+  [[nodiscard]] std::string outbox() const { return root + "/var/lib/kytreportingd/outbox"; }
   [[nodiscard]] std::string run() const { return root + "/run/kytreportingd"; }
   [[nodiscard]] std::string socket() const { return run() + "/com.vantu.kytreportingd"; }
   [[nodiscard]] std::string administration() const { return run() + "/admin"; }

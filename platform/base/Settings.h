@@ -21,6 +21,15 @@ struct CompressionSettings {
   friend bool operator==(const CompressionSettings&, const CompressionSettings&) = default;
 };
 
+// Of what could not be sent.
+struct OutboxSettings {
+  bool enabled = false;
+  uint64_t maxBytes = 67108864;         // on disk: addresses, headers and bodies
+  uint64_t maxAgeSeconds = 1209600;     // two weeks
+  uint64_t maxBytesPerUser = 33554432;  // so no user fills it
+  friend bool operator==(const OutboxSettings&, const OutboxSettings&) = default;
+};
+
 struct Settings {
   // Storebag hosts as addresses without a trailing slash ("https://bags.example.org"); the paths are
   // appended.
@@ -33,6 +42,7 @@ struct Settings {
   LogLevel logLevel = LogLevel::normal;
   CompressionSettings compression;
   std::string adminGroup;  // whose members may look at the daemon, by name; empty: none
+  OutboxSettings outbox;
   friend bool operator==(const Settings&, const Settings&) = default;
 };
 

@@ -152,6 +152,7 @@ class FakeURLSessionFactory::State : public std::enable_shared_from_this<FakeURL
   std::vector<std::unique_ptr<Entry>> entries_;
   Responder responder_;
   URLFigures figures_;
+  std::shared_ptr<Function<void()>> watcher_;
   size_t open_ = 0, sessions_ = 0, invalidated_ = 0;
   bool cancelled_ = false, awaitedCancelled_ = false;
 };
@@ -277,6 +278,25 @@ bool FakeURLSessionFactory::waitForRequests(size_t count, Duration timeout) cons
   std::unique_lock lock(state_->mutex_);
   return state_->grew_.wait_until(lock, std::chrono::steady_clock::now() + timeout,
                                   [&] { return state_->entries_.size() >= count; });
+}
+
+void FakeURLSessionFactory::watchConnectivity(std::shared_ptr<Function<void()>> changed) {
+  std::lock_guard lock(state_->mutex_);
+  state_->watcher_ = std::move(changed);
+}
+
+bool FakeURLSessionFactory::isWatched() const {
+  std::lock_guard lock(state_->mutex_);
+  return state_->watcher_ != nullptr;
+}
+
+void FakeURLSessionFactory::changeConnectivity() {
+  std::shared_ptr<Function<void()>> watcher;
+  {
+    std::lock_guard lock(state_->mutex_);
+    watcher = state_->watcher_;
+  }
+  if (watcher) (*watcher)();
 }
 
 size_t FakeURLSessionFactory::sessionsCreated() const {

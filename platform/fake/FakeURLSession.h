@@ -41,6 +41,9 @@ class FakeURLSessionFactory final : public URLSessionFactory {
   void cancelAll() override;
   [[nodiscard]] URLFigures figures() const override;
   [[nodiscard]] size_t outstanding() const override;
+  void watchConnectivity(std::shared_ptr<Function<void()>> changed) override;
+  void changeConnectivity();  // tells who watches
+  [[nodiscard]] bool isWatched() const;
 
   void setResponder(Responder responder);
 

@@ -134,6 +134,25 @@ TEST_F(Connectivity, EventsWaitWhileThereIsNoRouteAndArriveWhenItIsBack) {
   ASSERT_TRUE(route("add", "eth7"));
 }
 
+TEST_F(Connectivity, AnOutboxKeepsAtOnceWhatFindsNoRouteAndSendsItWhenThereIsOne) {
+  ASSERT_TRUE(route("add", "eth7"));
+  serveBag(false);
+  startDaemon("[outbox]\nenabled = true\n");
+  ASSERT_TRUE(there_->run("ip route add default via 10.77.0.2"));
+  TestClient client(daemon_->socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_->log();
+  ASSERT_TRUE(route("del", "eth7"));
+  server_->closeConnections();
+  ASSERT_TRUE(server_->waitForConnectionsOpen(0));
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", i}}));
+    EXPECT_EQ(client.flush(), "flushed") << daemon_->log();
+  }
+  EXPECT_EQ(posts("plain"), 0U);
+  ASSERT_TRUE(route("add", "eth7"));
+  EXPECT_TRUE(eventually([&] { return posts("plain") == 3; })) << daemon_->log();
+}
+
 // The server knows nothing of it and keeps its connections.
 TEST_F(Connectivity, EventsWaitAlsoWhereAConnectionIsKeptAndArriveOnceFromAnotherAddress) {
   ASSERT_TRUE(route("add", "eth7"));

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <fstream>
 #include <map>
 #include <sstream>
 #include <string>
@@ -211,8 +212,13 @@ TEST_F(KytctlOwner, ErasesWithoutADaemon) {
   end();
   const std::string before = identifierIn(shown());
   ASSERT_EQ(messageLogs(), 1U);
+  const std::string outbox = stage_->folder() + "/var/lib/kytreportingd/outbox/outbox.sqlite";
+  std::filesystem::create_directories(std::filesystem::path(outbox).parent_path());
+  for (const char* ending : {"", "-wal", ".damaged"}) std::ofstream(outbox + ending) << "a post";
   const ProgramRun run = kytctl({"owner", "erase"});
   EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_TRUE(has(run.text, "Erased: what could not be sent\n")) << run.text;
+  EXPECT_TRUE(std::filesystem::is_empty(std::filesystem::path(outbox).parent_path()));
   EXPECT_TRUE(has(run.text, ", 1 message logs, the record of what left\n")) << run.text;
   EXPECT_TRUE(has(run.text, "  server     " + stage_->httpsBase() + "\n")) << run.text;
   EXPECT_TRUE(has(run.text, "  identifier " + before + "\n")) << run.text;

@@ -29,7 +29,7 @@ TEST(ManualExamples, OfFilesAreTaken) {
   expectTaken(parseFlatToml(exampleOf("kytreportingd-device.toml.5", "device"), "device"));
   expectTaken(parseFlatToml(exampleOf("kytreportingd-defaults.5", "defaults"), "defaults"));
   const ProfileVariables variables = {{"CONFIG", "/c"}, {"SETTINGS", "/t"}, {"SHARE", "/s"}, {"CA", "/a"},
-                                      {"STATE", "/t"},  {"LOGS", "/l"},     {"RUN", "/r"}};
+                                      {"STATE", "/t"},  {"OUTBOX", ""},     {"LOGS", "/l"},  {"RUN", "/r"}};
   expectTaken(parseProfile(exampleOf("kytreportingd-profile.5", "profile"), "profile", variables));
 }
 

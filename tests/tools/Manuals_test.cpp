@@ -165,8 +165,9 @@ TEST(AdministratorsGuide, NamesEachSettingWithItsDefault) {
   const std::vector<std::string> settings = settingNames();
   const std::string guide = textOf("docs/ADMINISTRATION.md");
   EXPECT_EQ(
-      matchesIn(guide,
-                "\n\\| `((?:storebag|tls|network|limits|service|log|compression|admin)\\.[a-z_]+)` \\|"),
+      matchesIn(
+          guide,
+          "\n\\| `((?:storebag|tls|network|limits|service|log|compression|admin|outbox)\\.[a-z_]+)` \\|"),
       Names(settings.begin(), settings.end()));
   for (const std::string& name : settings) {
     if (!hasDefault(name)) continue;

@@ -11,7 +11,7 @@ namespace {
 // The first group of every match in the daemon's own sources.
 Names inSources(const char* expression) {
   Names found;
-  for (const char* folder : {"platform", "config", "backend", "backends", "session", "daemon"})
+  for (const char* folder : {"platform", "config", "backend", "backends", "session", "outbox", "daemon"})
     for (const auto& entry :
          std::filesystem::recursive_directory_iterator(KYT_SOURCE_DIR "/" + std::string(folder))) {
       const std::string path = entry.path().string();

@@ -292,6 +292,15 @@ class Owner {
     int status = 0;
     for (const MessageLog& one : logs_)
       if (::unlink(one.path.c_str()) != 0 && errno != ENOENT) status = failedAt(one.path);
+    bool wasKept = false;
+    for (const char* name : {"/outbox.sqlite", "/outbox.sqlite-wal", "/outbox.sqlite.damaged"}) {
+      const std::string kept = paths_.outbox() + name;
+      if (::unlink(kept.c_str()) == 0)
+        wasKept = true;
+      else if (errno != ENOENT)
+        status = failedAt(kept);
+    }
+    if (wasKept) std::printf("Erased: what could not be sent\n");
     const std::string file = DepartureFile::pathIn(paths_.userDefaults());
     if (::unlink(file.c_str()) != 0 && errno != ENOENT) status = failedAt(file);
     if (status == 0) tellErased(daemon > 0);

@@ -10,6 +10,7 @@
 #   ${CONFIG}   /etc/kytreportingd            ${STATE}    /var/lib/kytreportingd/defaults
 #   ${SHARE}    <share>/kytreporting          ${RUN}      /run/kytreportingd
 #   ${PLUGINS}  /System/Library/PrivateFrameworks         ${LOGS}   /var/mobile/Library/Logs/Faultbin
+#   ${OUTBOX}   /var/lib/kytreportingd/outbox, when outbox.enabled is set
 #   ${CA}       the folder of tls.ca_file, when one is set
 #   ${SETTINGS} the folder of --config's file, when it is not ${CONFIG}
 #
@@ -49,6 +50,7 @@ read = [
 
 write = [
   "${STATE}",
+  "${OUTBOX}",
   "/dev/null",
 ]
 

@@ -143,6 +143,25 @@ const char* setAdminGroup(const TomlNode& node, Settings& settings) {
   return nullptr;
 }
 
+const char* setOutboxEnabled(const TomlNode& node, Settings& settings) {
+  const auto* enabled = std::get_if<bool>(&node.value);
+  if (enabled == nullptr) return "must be true or false";
+  settings.outbox.enabled = *enabled;
+  return nullptr;
+}
+
+template <uint64_t OutboxSettings::*field, int64_t least, int64_t most>
+const char* setOutboxNumber(const TomlNode& node, Settings& settings) {
+  const auto* number = std::get_if<int64_t>(&node.value);
+  if (number == nullptr || *number < least || *number > most) {
+    static const std::string wrong =
+        "must be a whole number from " + std::to_string(least) + " to " + std::to_string(most);
+    return wrong.c_str();
+  }
+  settings.outbox.*field = static_cast<uint64_t>(*number);
+  return nullptr;
+}
+
 // The member that a setting is, wherever in the settings it stands.
 template <auto field, typename Whole>
 auto& memberOf(Whole& settings) {
@@ -150,6 +169,8 @@ auto& memberOf(Whole& settings) {
     return settings.limits.*field;
   else if constexpr (requires { settings.compression.*field; })
     return settings.compression.*field;
+  else if constexpr (requires { settings.outbox.*field; })
+    return settings.outbox.*field;
   else
     return settings.*field;
 }
@@ -175,6 +196,9 @@ constexpr Setting setting(std::string_view section, std::string_view key, Setter
 }
 
 constexpr uint64_t kLargestMessage = 134217728;  // the wire protocol's own limit
+
+constexpr int64_t kLeastOutbox = 65536, kLargestOutbox = int64_t{1} << 40;  // bytes
+constexpr int64_t kYear = 31536000;                                         // seconds
 
 constexpr Setting kSettings[] = {
     setting<&Settings::storebagInternalHost>("storebag", "internal_host",
@@ -222,6 +246,16 @@ constexpr Setting kSettings[] = {
     setting<&CompressionSettings::library>("compression", "library", setCompressionLibrary, Taking::atStart),
     setting<&CompressionSettings::level>("compression", "level", setCompressionLevel, Taking::atStart),
     setting<&Settings::adminGroup>("admin", "group", setAdminGroup, Taking::atStart),
+    setting<&OutboxSettings::enabled>("outbox", "enabled", setOutboxEnabled, Taking::atStart),
+    setting<&OutboxSettings::maxBytes>(
+        "outbox", "max_bytes", setOutboxNumber<&OutboxSettings::maxBytes, kLeastOutbox, kLargestOutbox>,
+        Taking::atStart),
+    setting<&OutboxSettings::maxAgeSeconds>("outbox", "max_age_seconds",
+                                            setOutboxNumber<&OutboxSettings::maxAgeSeconds, 1, kYear>,
+                                            Taking::atStart),
+    setting<&OutboxSettings::maxBytesPerUser>(
+        "outbox", "max_bytes_per_user",
+        setOutboxNumber<&OutboxSettings::maxBytesPerUser, kLeastOutbox, kLargestOutbox>, Taking::atStart),
 };
 
 bool isSection(std::string_view name) {

@@ -62,6 +62,9 @@ void CurlURLSessionFactory::cancelAwaited() {
 void CurlURLSessionFactory::cancelAll() {
   network_->cancelAll();
 }
+void CurlURLSessionFactory::watchConnectivity(std::shared_ptr<Function<void()>> changed) {
+  network_->watchConnectivity(std::move(changed));
+}
 URLFigures CurlURLSessionFactory::figures() const {
   return network_->figures();
 }

@@ -89,6 +89,7 @@ class CurlURLSessionFactory final : public URLSessionFactory {
   void cancelAll() override;
   [[nodiscard]] URLFigures figures() const override;
   [[nodiscard]] size_t outstanding() const override;
+  void watchConnectivity(std::shared_ptr<Function<void()>> changed) override;
 
  private:
   std::shared_ptr<URLNetwork> network_;

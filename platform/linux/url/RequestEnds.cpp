@@ -37,6 +37,10 @@ bool saysNoRoute(long systemError) {
   return systemError == ENETUNREACH || systemError == EHOSTUNREACH || systemError == ENETDOWN;
 }
 
+bool mayWait(const URLTransfer& transfer) {
+  return transfer.session->configuration.waitsForConnectivity && !transfer.request.neverWaits;
+}
+
 }  // namespace
 
 void RequestEnds::deadlinePassed(URLTransfer& transfer) {
@@ -125,7 +129,7 @@ bool RequestEnds::goAgainOrWait(URLTransfer& transfer) {
     requests_.activateAgain(transfer);
     return true;
   }
-  if (!transfer.session->configuration.waitsForConnectivity || requests_.canLeave(transfer)) return false;
+  if (!mayWait(transfer) || requests_.canLeave(transfer)) return false;
   requests_.setAside(transfer);
   return true;
 }
@@ -171,7 +175,7 @@ void RequestEnds::lookAtLostConnection(URLTransfer& transfer) {
 }
 
 bool RequestEnds::retryOrWait(URLTransfer& transfer, CURLcode code, long systemError) {
-  if (!transfer.session->configuration.waitsForConnectivity) return false;
+  if (!mayWait(transfer)) return false;
   if (!mayComeOfBeingOffline(code)) return false;
   if (code == CURLE_COULDNT_RESOLVE_HOST) transfer.attempt.addresses.clear();
   if (!requests_.canLeave(transfer)) {

@@ -35,6 +35,9 @@ class URLNetwork {
   void cancelAwaited();
   void cancelAll();
   void reconfigure(CurlURLSessionFactory::Access access);
+  void watchConnectivity(std::shared_ptr<Function<void()>> changed) {
+    requests_.watchConnectivity(std::move(changed));
+  }
   // Cancels what is left, and ends the threads; false when completions still run after `patience`. Once, not from a
   // thread of this network.
   [[nodiscard]] bool stopWithin(Duration patience);

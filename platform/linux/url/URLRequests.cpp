@@ -27,7 +27,7 @@ URLRequests::URLRequests(NetworkTools& tools, Completions& completions)
       completions_(completions),
       lines_(tools.options.maxActiveRequests, tools.options.maxActiveRequestsToOneServer),
       routes_(tools, {[this] { routesSettled(); }, [this] { waiting_.retry(sessions_, true); },
-                      [this] { return !waiting_.empty() || !sessions_.empty(); }}),
+                      [this] { return !waiting_.empty() || !sessions_.empty() || watcher() != nullptr; }}),
       pools_(*this, tools, routes_),
       waiting_(tools, {[this](URLTransfer& oldest) { displace(oldest); },
                        [this](URLTransfer& transfer) {
@@ -166,6 +166,17 @@ void URLRequests::routesSettled() {
     session = next;
   }
   waiting_.retry(sessions_, false);
+  if (const auto changed = watcher()) (*changed)();
+}
+
+void URLRequests::watchConnectivity(std::shared_ptr<Function<void()>> changed) {
+  MutexLock lock(watcherMutex_);
+  watcher_ = std::move(changed);
+}
+
+std::shared_ptr<Function<void()>> URLRequests::watcher() {
+  MutexLock lock(watcherMutex_);
+  return watcher_;
 }
 
 void URLRequests::emptyRetiredPools() {

@@ -6,6 +6,8 @@
 #include <memory>
 #include <string>
 
+#include "platform/base/Function.h"
+#include "platform/base/Mutex.h"
 #include "platform/linux/url/Completions.h"
 #include "platform/linux/url/ConnectionPools.h"
 #include "platform/linux/url/LinkedList.h"
@@ -30,6 +32,8 @@ class URLRequests {
   void wantNone() { noneWanted_ = true; }
   void wantNoneAwaited() { noneAwaitedWanted_ = true; }
   [[nodiscard]] bool isNoneWanted() const { return noneWanted_; }
+  // Any thread: see URLSessionFactory::watchConnectivity.
+  void watchConnectivity(std::shared_ptr<Function<void()>> changed) EXCLUDES(watcherMutex_);
 
   // What the event loop does.
   void begin(std::shared_ptr<URLTransfer> transfer);
@@ -67,8 +71,11 @@ class URLRequests {
   void cancelThose(bool onlyAwaited);
   void routesSettled();
   void beQuiet();
+  [[nodiscard]] std::shared_ptr<Function<void()>> watcher() EXCLUDES(watcherMutex_);
 
   std::atomic<bool> noneWanted_{false}, noneAwaitedWanted_{false};  // self-synchronised
+  Mutex watcherMutex_;
+  std::shared_ptr<Function<void()>> watcher_ GUARDED_BY(watcherMutex_);
 
   NetworkTools& tools_;
   Completions& completions_;

@@ -90,6 +90,7 @@ class LinuxConfinementTest : public testing::Test {
              {"SHARE", folder / "share"},
              {"PLUGINS", folder / "plugins"},
              {"STATE", folder / "var/lib/kytreportingd/defaults"},
+             {"OUTBOX", ""},
              {"LOGS", folder / "logs"},
              {"RUN", folder / "run"},
              {"CA", folder / "ca"}}};

@@ -34,6 +34,7 @@ TEST(TomlSettings, TheTwoHostsAreEnough) {
   EXPECT_EQ(settings.logTarget, LogTarget::automatic);
   EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::zlib, 6}));
   EXPECT_EQ(settings.adminGroup, "");
+  EXPECT_EQ(settings.outbox, (OutboxSettings{false, 67108864, 1209600, 33554432}));
   const Limits defaults;
   EXPECT_EQ(settings.limits.maxMessageBytes, defaults.maxMessageBytes);
   EXPECT_EQ(settings.limits.maxSharedDataBytesPerUser, 16777216u);
@@ -81,6 +82,11 @@ library = "libdeflate"
 level = 9
 [admin]
 group = "adm"
+[outbox]
+enabled = true
+max_bytes = 65536
+max_age_seconds = 60
+max_bytes_per_user = 65537
 )");
   EXPECT_EQ(settings.logLevel, LogLevel::debug);
   EXPECT_EQ(settings.caFile, "/etc/ca.pem");
@@ -102,6 +108,7 @@ group = "adm"
   EXPECT_EQ(settings.logTarget, LogTarget::standardError);
   EXPECT_EQ(settings.compression, (CompressionSettings{CompressionLibrary::libdeflate, 9}));
   EXPECT_EQ(settings.adminGroup, "adm");
+  EXPECT_EQ(settings.outbox, (OutboxSettings{true, 65536, 60, 65537}));
 }
 
 TEST(TomlSettings, AHostsTrailingSlashIsDropped) {
@@ -188,6 +195,12 @@ TEST(TomlSettings, WrongTypesAndNumbersOutOfRangeAreErrorsWithTheirLine) {
   for (const char* group : {"4", "\"\"", "[]"})
     EXPECT_EQ(other(std::string("[admin]\ngroup = ") + group + "\n"),
               "k.toml:5: \"admin.group\" must be the name of a group");
+  EXPECT_EQ(other("[outbox]\nenabled = 1\n"), "k.toml:5: \"outbox.enabled\" must be true or false");
+  for (const char* bytes : {"0", "65535", "1099511627777", "true", "1e6"})
+    EXPECT_EQ(other(std::string("[outbox]\nmax_bytes = ") + bytes + "\n"),
+              "k.toml:5: \"outbox.max_bytes\" must be a whole number from 65536 to 1099511627776");
+  EXPECT_EQ(other("[outbox]\nmax_age_seconds = 0\n"),
+            "k.toml:5: \"outbox.max_age_seconds\" must be a whole number from 1 to 31536000");
   EXPECT_EQ(other("[tls]\nca_file = \"ca.pem\"\n"),
             "k.toml:5: \"tls.ca_file\" must be the absolute path of a file");
   EXPECT_EQ(other("[network]\ncellular_interfaces = \"wwan0\"\n"),

@@ -67,6 +67,29 @@ TEST_F(CurlURLSessionConnectivity, WaitsWithoutARouteAndGoesOutWhenItAppears) {
   EXPECT_EQ(factory().figures().waitingBytes, 0u);
 }
 
+TEST_F(CurlURLSessionConnectivity, FailsAtOnceWhatNeverWaits) {
+  auto urls = session(true);
+  URLRequest request = post(server_->url("/"), "x");
+  request.neverWaits = true;
+  const Outcome outcome = perform(*urls, std::move(request));
+  EXPECT_EQ(outcome.errorCode(), CURLE_COULDNT_CONNECT);
+  EXPECT_EQ(factory().figures().waiting, 0u);
+}
+
+TEST_F(CurlURLSessionConnectivity, TellsWhoWatchesThatConnectivityHasChanged) {
+  std::atomic<int> changes{0};
+  factory().watchConnectivity(std::make_shared<Function<void()>>([&changes] { ++changes; }));
+  auto urls = session();
+  EXPECT_NE(perform(*urls, get(server_->url("/"))).errorCode(), 0);
+  ASSERT_TRUE(restoreRoute());
+  EXPECT_TRUE(eventually([&] { return changes > 0; }));
+  factory().watchConnectivity(nullptr);
+  const int before = changes;
+  ASSERT_TRUE(here_->run("ip route del 10.78.0.0/24"));
+  EXPECT_NE(perform(*urls, get(server_->url("/"))).errorCode(), 0);
+  EXPECT_EQ(changes, before);
+}
+
 TEST_F(CurlURLSessionConnectivity, WaitsAgainEachTimeTheRouteVanishes) {
   auto urls = session(true);
   for (int i = 0; i < 3; ++i) {

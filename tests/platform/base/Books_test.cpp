@@ -109,6 +109,69 @@ TEST_F(BooksTest, BookAPostThatNobodyAnswersAsCutOff) {
   EXPECT_EQ(row().droppedInAll(), 3U) << "each once";
 }
 
+TEST_F(BooksTest, KnowWhatTheOutboxKeepsUntilItIsDeliveredOrLost) {
+  open();
+  PostedEvents posted(taken(5), counters_);
+  posted.events()->keep();
+  EXPECT_EQ(row().outbox, 5U);
+  EXPECT_EQ(row().inFlight, 0U);
+  EXPECT_EQ(row().pending(), 5U);
+  expectClosed(row());
+  tally_->leaveOutbox(3);
+  tally_->deliver(3);
+  tally_->leaveOutbox(2);
+  tally_->drop(Reason::outboxTooOld, 2);
+  EXPECT_EQ(row().outbox, 0U);
+  EXPECT_EQ(row().delivered, 3U);
+  EXPECT_EQ(row().droppedFor(Reason::outboxTooOld), 2U);
+  expectClosed(row());
+}
+
+TEST_F(BooksTest, LetNobodyCloseAPostThatTheOutboxHas) {
+  open();
+  for (int end = 0; end < 3; ++end) {
+    PostedEvents posted(taken(1), counters_);
+    posted.events()->keep();
+    if (end == 0) posted.delivered();
+    if (end == 1) posted.dropped(Reason::postFailed);
+  }
+  EXPECT_EQ(row().outbox, 3U);
+  EXPECT_EQ(row().delivered, 0U);
+  EXPECT_EQ(row().droppedInAll(), 0U);
+  EXPECT_EQ(counters_.value(Reason::postFailed), 0U);
+  expectClosed(row());
+}
+
+TEST_F(BooksTest, TakeOverWhatAnEarlierProcessKeptByTheNameOfItsRow) {
+  open();
+  const BookedEvents events = taken(4);
+  const std::vector<BookedEvents::OfRow> rows = events.rows();
+  ASSERT_EQ(rows.size(), 1U);
+  EXPECT_EQ(rows[0].events, 4U);
+  Books next;
+  next.reopen(rows[0].row)->restore(rows[0].events);
+  const std::vector<BookRow> restored = next.snapshot();
+  ASSERT_EQ(restored.size(), 1U);
+  EXPECT_EQ(restored[0].program, kProgram);
+  EXPECT_EQ(restored[0].backEnd, "httppost");
+  EXPECT_EQ(restored[0].taken, 4U);
+  EXPECT_EQ(restored[0].outbox, 4U);
+  expectClosed(restored[0]);
+}
+
+TEST_F(BooksTest, TakeOverTheRowOfThoseThatHadNoRoom) {
+  for (size_t i = 0; i < Limits::maxBookRowsOfUser; ++i)
+    static_cast<void>(books_.open({1000, 7, std::to_string(i), ""}, "httppost", false));
+  const auto merged = books_.open({1000, 7, "one too many", ""}, "httppost", false);
+  EXPECT_TRUE(merged->rowName().isOther);
+  Books next;
+  next.reopen(merged->rowName())->restore(2);
+  ASSERT_EQ(next.snapshot().size(), 1U);
+  EXPECT_EQ(next.snapshot()[0].backEnd, "other");
+  EXPECT_EQ(next.snapshot()[0].programsMerged, 1U);
+  EXPECT_EQ(next.snapshot()[0].outbox, 2U);
+}
+
 TEST_F(BooksTest, KeepWhatTalliesCountedThatAreGone) {
   for (int i = 0; i < 3; ++i) {
     open();

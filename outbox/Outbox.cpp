@@ -1,0 +1,345 @@
+// What comes in, and what is kept. OutboxSending.cpp sends it again.
+#include "outbox/Outbox.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "platform/DeviceProperties.h"
+#include "platform/base/Limits.h"
+#include "platform/base/Semaphore.h"
+#include "platform/queues/Log.h"
+
+namespace kyt {
+namespace {
+
+constexpr int64_t kClockWasSet = 1577836800;  // a clock before 2020 has not been set
+
+}  // namespace
+
+std::shared_ptr<Outbox> Outbox::create(Ports ports, OutboxSettings settings) {
+  return std::shared_ptr<Outbox>(new Outbox(ports, settings));
+}
+
+Outbox::Outbox(Ports ports, OutboxSettings settings)
+    : ports_(ports),
+      settings_(settings),
+      queue_(SerialQueue::create("kyt.outbox", ports.executor)),
+      books_(ports.books, ports.counters) {}
+
+void Outbox::begin() {
+  wake();
+}
+
+void Outbox::wake() {
+  {
+    MutexLock lock(mutex_);
+    if (std::exchange(isAwake_, true)) return;
+  }
+  queue_->asyncBeside([self = shared_from_this()] {
+    self->queue_->assertCurrent();
+    self->turn();
+  });
+}
+
+bool Outbox::isTaking() const {
+  MutexLock lock(mutex_);
+  return ports_.clock.monotonic() >= diskRestsUntil_;
+}
+
+void Outbox::refuse(Incoming& post) {
+  if (ports_.counters.addAndMayLog(Reason::postNotKept, ports_.clock.monotonic()))
+    ports_.log.error("Outbox(keep): A post to %s that failed cannot be kept",
+                     serverOfLine(post.failed.post.url).c_str());
+  post.settled(false);
+}
+
+void Outbox::keep(FailedPost post, Function<void(bool)> settled) {
+  const uint64_t bytes = PostStore::bytesOf(post.post);
+  Incoming incoming{std::move(post), std::move(settled)};
+  bool hasRoom = false;
+  {
+    MutexLock lock(mutex_);
+    hasRoom = ports_.clock.monotonic() >= diskRestsUntil_ &&
+              (bytesOnTheWay_ == 0 || bytesOnTheWay_ + bytes <= Limits::maxBytesOnTheWayToTheOutbox);
+    if (hasRoom) {
+      bytesOnTheWay_ += bytes;
+      inbox_.bytes += bytes;
+      inbox_.posts.push_back(std::move(incoming));
+    }
+  }
+  if (hasRoom)
+    wake();
+  else
+    refuse(incoming);
+}
+
+void Outbox::serverAnswers(std::string_view url) {
+  if (!someFail_.load(std::memory_order_relaxed)) return;
+  constexpr size_t kMostServers = 64;
+  {
+    std::string server = serverOfLine(url);
+    MutexLock lock(mutex_);
+    std::vector<std::string>& known = inbox_.answering;
+    if (known.size() >= kMostServers || std::find(known.begin(), known.end(), server) != known.end()) return;
+    known.push_back(std::move(server));
+  }
+  wake();
+}
+
+void Outbox::flush() {
+  {
+    MutexLock lock(mutex_);
+    inbox_.flush = true;
+  }
+  wake();
+}
+
+int64_t Outbox::seconds() const {
+  return std::chrono::duration_cast<std::chrono::seconds>(ports_.clock.monotonic().time_since_epoch())
+      .count();
+}
+
+// A clock that jumps makes no post old.
+int64_t Outbox::bornAt(int64_t keptAt) const {
+  const int64_t now = ports_.clock.timeOfDay().seconds;
+  if (keptAt == 0 || now < kClockWasSet || keptAt > now) return seconds();
+  return seconds() - (now - keptAt);
+}
+
+void Outbox::turn() {
+  Inbox inbox;
+  {
+    MutexLock lock(mutex_);
+    isAwake_ = false;
+    std::swap(inbox, inbox_);
+  }
+  if (!isLoaded_) load();
+  for (Answer& answer : inbox.answers) take(answer);
+  if (isLoaded_) {
+    forgetWithoutConsent();
+    forgetTooOld();
+  }
+  keepAll(std::move(inbox.posts));
+  {
+    MutexLock lock(mutex_);
+    bytesOnTheWay_ -= inbox.bytes;
+  }
+  takeNews(inbox);
+  if (posts_.size() == 0 && isLoaded_) {
+    books_.dropRest(Reason::outboxUnreadable);  // of posts that were not what had been kept
+    if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) ports_.store.becameEmpty();
+  }
+  posts_.forgetGone();
+  size_.store(posts_.size(), std::memory_order_relaxed);
+  if (isClosed_) return ports_.store.close();
+  sendWhatIsDue();
+  watchConnectivity();
+  setTimer();
+}
+
+void Outbox::load() {
+  if (!isTaking()) return;
+  const auto problem = ports_.store.open([this](StoredPostHead head) {
+    queue_->assertCurrent();
+    StoredPost& post = head.post;
+    posts_.add(post.number, serverOfLine(post.url), head.bytes, post.user, post.isByConsent,
+               bornAt(post.keptAt));
+    last_ = post.number;
+    books_.restore(post.events);
+  });
+  if (problem && problem->kind == PostStoreProblem::Kind::unavailable) {
+    // Once more, from the beginning.
+    books_.dropRest(Reason::outboxUnreadable);
+    posts_.clear();
+    return handle(*problem);
+  }
+  isLoaded_ = true;
+  if (problem) return handle(*problem);
+  if (posts_.size() == 0) return;
+  ports_.log.normal("Outbox: %zu posts of %llu bytes are left from before", posts_.size(),
+                    static_cast<unsigned long long>(posts_.bytes()));
+  // Devices that start at the same time do not all ask at the same time.
+  for (auto& [server, line] : posts_.lines()) fail(line, std::nullopt, true);
+}
+
+OutboxBooks::Events Outbox::eventsOf(int64_t number) {
+  if (const auto sending = inFlight_.find(number); sending != inFlight_.end()) return sending->second->events;
+  auto read = ports_.store.read(number);
+  if (auto* post = std::get_if<StoredPost>(&read)) return std::move(post->events);
+  return {};
+}
+
+void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
+  const OutboxBooks::Events events = eventsOf(entry.number);
+  if (const auto sending = inFlight_.find(entry.number); sending != inFlight_.end()) {
+    sending->second->isAbandoned = true;
+    if (sending->second->task) sending->second->task->cancel();
+  }
+  books_.drop(events, fate);
+  removed_.push_back(entry.number);
+  posts_.remove(entry);
+}
+
+void Outbox::forgetWithoutConsent() {
+  isConsentGiven_ = ports_.consent.isSubmissionAllowed();
+  if (isConsentGiven_ || posts_.byConsent() == 0) return;
+  ports_.log.normal("Outbox: The consent is withdrawn, %zu posts that were collected by it are deleted",
+                    posts_.byConsent());
+  for (KeptPosts::Entry& entry : posts_.entries())
+    if (!entry.isGone && entry.isByConsent) leave(entry, Reason::outboxConsentWithdrawn);
+  removesForGood_ = true;
+}
+
+void Outbox::forgetTooOld() {
+  const int64_t oldest = seconds() - static_cast<int64_t>(settings_.maxAgeSeconds);
+  for (KeptPosts::Entry& entry : posts_.entries()) {
+    if (entry.isGone) continue;
+    if (entry.born >= oldest) break;
+    leave(entry, Reason::outboxTooOld);
+  }
+}
+
+uint64_t Outbox::drop(Filter filter) {
+  return queue_->sync([&]() -> uint64_t {
+    queue_->assertCurrent();
+    uint64_t dropped = 0;
+    for (KeptPosts::Entry& entry : posts_.entries()) {
+      const bool isMeant = !entry.isGone && (!filter.user || *filter.user == entry.user) &&
+                           (!filter.server || *filter.server == entry.line->server);
+      if (!isMeant) continue;
+      leave(entry, Reason::outboxDropped);
+      ++dropped;
+    }
+    removesForGood_ = removesForGood_ || dropped != 0;
+    turn();
+    return dropped;
+  });
+}
+
+// The oldest of the user's where his share is full, the oldest of all where the outbox is. False: there is none that is on
+// disk already.
+bool Outbox::makeRoom(Plan& plan, uint32_t user, uint64_t bytes) {
+  for (;;) {
+    const bool isShareFull = posts_.bytesOfUser(user) + bytes > settings_.maxBytesPerUser;
+    const bool isFull =
+        posts_.bytes() + bytes > settings_.maxBytes || posts_.size() >= Limits::maxOutboxPosts;
+    if (!isShareFull && !isFull) return true;
+    KeptPosts::Entry* oldest = isShareFull ? posts_.oldestOfUser(user) : posts_.oldest();
+    if (oldest == nullptr || oldest->number > last_) return false;
+    plan.displaced.push_back(oldest->number);
+    posts_.remove(*oldest);
+  }
+}
+
+void Outbox::keepAll(std::vector<Incoming> posts) {
+  Plan plan;
+  const int64_t now = ports_.clock.timeOfDay().seconds;
+  for (Incoming& incoming : posts) {
+    StoredPost& post = incoming.failed.post;
+    const uint64_t bytes = PostStore::bytesOf(post);
+    const bool fits =
+        bytes <= settings_.maxBytes && bytes <= settings_.maxBytesPerUser && bytes <= UINT32_MAX;
+    if (!isLoaded_ || !fits || !isTaking() || (post.isByConsent && !isConsentGiven_)) {
+      refuse(incoming);
+      continue;
+    }
+    if (!makeRoom(plan, post.user, bytes)) {
+      commit(std::move(plan));  // what is new is displaced only when it is there
+      plan = Plan();
+      if (!isTaking() || !makeRoom(plan, post.user, bytes)) {
+        refuse(incoming);
+        continue;
+      }
+    }
+    post.number = last_ + 1 + static_cast<int64_t>(plan.posts.size());
+    post.keptAt = now >= kClockWasSet ? now : 0;
+    post.events = incoming.failed.booked ? incoming.failed.booked->rows() : OutboxBooks::Events();
+    posts_.add(post.number, serverOfLine(post.url), bytes, post.user, post.isByConsent, seconds());
+    plan.posts.push_back(std::move(incoming));
+  }
+  commit(std::move(plan));
+}
+
+void Outbox::commit(Plan plan) {
+  if (plan.posts.empty() && plan.displaced.empty() && removed_.empty()) return;
+  if (!isTaking()) return notKept(plan);
+  std::vector<OutboxBooks::Events> displaced;
+  displaced.reserve(plan.displaced.size());
+  for (const int64_t number : plan.displaced) displaced.push_back(eventsOf(number));
+  std::vector<const StoredPost*> added;
+  added.reserve(plan.posts.size());
+  for (const Incoming& post : plan.posts) added.push_back(&post.failed.post);
+  const size_t removedBefore = removed_.size();
+  removed_.insert(removed_.end(), plan.displaced.begin(), plan.displaced.end());
+  if (const auto problem = ports_.store.change(added, removed_, removesForGood_)) {
+    removed_.resize(removedBefore);
+    notKept(plan);
+    return handle(*problem);
+  }
+  removed_.clear();
+  removesForGood_ = false;
+  kept(plan, displaced);
+}
+
+void Outbox::kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced) {
+  for (const OutboxBooks::Events& events : displaced) books_.drop(events, Reason::outboxDisplaced);
+  if (!displaced.empty() &&
+      ports_.counters.addAndMayLog(Reason::outboxDisplaced, ports_.clock.monotonic(), 0))
+    ports_.log.error("Outbox(keep): It is full, %zu of the oldest posts are lost for newer ones",
+                     displaced.size());
+  for (Incoming& incoming : plan.posts) {
+    last_ = incoming.failed.post.number;
+    const StoredPost& post = incoming.failed.post;
+    books_.enter(incoming.failed.booked.get(), post.events);
+    if (incoming.failed.mayHaveLeft)
+      tellOwner(post.url, post.events, post.body.view().size(), !incoming.failed.isUnanswered);
+    ServerLine& line = *posts_.find(last_)->line;
+    // What is being sent says by itself how the server is.
+    if (line.inFlight == 0 && line.failures == 0)
+      fail(line, incoming.failed.retryAfter, incoming.failed.isUnanswered);
+    else if (line.failures != 0 && incoming.failed.retryAfter)
+      pause(line, *incoming.failed.retryAfter);
+    incoming.settled(true);
+  }
+}
+
+void Outbox::notKept(Plan& plan) {
+  for (Incoming& incoming : plan.posts) {
+    posts_.removeNewest();
+    refuse(incoming);
+  }
+  for (const int64_t number : plan.displaced) posts_.putBack(number);
+}
+
+void Outbox::handle(const PostStoreProblem& problem) {
+  if (problem.kind == PostStoreProblem::Kind::damaged) {
+    ports_.counters.add(Reason::outboxFileDamaged);
+    ports_.log.error("Outbox: Its file is damaged, %zu posts are lost: %s; %s", posts_.size(),
+                     problem.text.c_str(), ports_.store.setAside().c_str());
+    for (auto& [number, sending] : inFlight_) sending->isAbandoned = true;
+    posts_.clear();
+    removed_.clear();
+    books_.dropRest(Reason::outboxUnreadable);
+    return;
+  }
+  {
+    MutexLock lock(mutex_);
+    diskRestsUntil_ = ports_.clock.monotonic() + kDiskPause;
+  }
+  if (ports_.counters.mayTell(Reason::postNotKept, problem.text, ports_.clock.monotonic()))
+    ports_.log.error("Outbox: Its file cannot be used for now: %s", problem.text.c_str());
+}
+
+bool Outbox::finishWithin(Duration patience) {
+  stopSending();
+  const auto done = std::make_shared<Semaphore>();
+  queue_->asyncBeside([self = shared_from_this(), done] {
+    self->queue_->assertCurrent();
+    self->isClosed_ = true;
+    self->turn();
+    done->signal();
+  });
+  return done->waitFor(patience);
+}
+
+}  // namespace kyt

@@ -1,0 +1,206 @@
+// What could not be sent: posts of events that failed, kept on disk and sent again until they are taken, refused for good,
+// too old or displaced. docs/ARCHITECTURE.md says how it works. Made and owned by the composition root where the settings
+// ask for it; fed by OutboxURLSession.
+//
+// All of it runs on a queue of its own, whose executor has threads for that, since the disk may take its time: no session
+// waits for it. Any thread may call what is public; list(), drop() and finish() may wait for the disk.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "outbox/KeptPosts.h"
+#include "outbox/OutboxBooks.h"
+#include "outbox/PostVerdict.h"
+#include "platform/PostStore.h"
+#include "platform/URLSession.h"
+#include "platform/base/Clock.h"
+#include "platform/base/Counters.h"
+#include "platform/base/Departures.h"
+#include "platform/base/Function.h"
+#include "platform/base/Mutex.h"
+#include "platform/base/Settings.h"
+#include "platform/queues/SerialQueue.h"
+#include "platform/queues/Timer.h"
+
+namespace kyt {
+
+class DiagnosticsConsent;
+class Log;
+class RandomSource;
+
+// A post of events that failed.
+struct FailedPost {
+  StoredPost post;                             // without number and time
+  std::shared_ptr<const BookedEvents> booked;  // whose they are; null: nobody's
+  std::optional<Duration> retryAfter;
+  bool isUnanswered = false, mayHaveLeft = true;
+};
+
+class Outbox final : public std::enable_shared_from_this<Outbox> {
+ public:
+  struct Ports {
+    Clock& clock;
+    TimerService& timers;
+    RandomSource& random;
+    Executor& executor;
+    DiagnosticsConsent& consent;
+    Counters& counters;
+    Log& log;
+    Books& books;
+    Departures& departures;
+    URLSessionFactory& network;
+    PostStore& store;
+  };
+  // Of one server's line, for people.
+  struct Server {
+    std::string server;
+    uint64_t posts = 0, bytes = 0, inFlight = 0;
+    unsigned failures = 0;    // in a row
+    Duration oldest{};        // age
+    Duration untilNextTry{};  // 0: now
+  };
+  // What an administrator drops: all where nothing is said.
+  struct Filter {
+    std::optional<std::string> server;
+    std::optional<uint32_t> user;
+  };
+
+  // The longest between two looks at age and consent, and after a disk's failure.
+  static constexpr std::chrono::minutes kLongestRest{30};
+  static constexpr std::chrono::seconds kDiskPause{30};
+  static constexpr unsigned kMostAtATime = 4;  // to one server that takes them
+
+  [[nodiscard]] static std::shared_ptr<Outbox> create(Ports ports, OutboxSettings settings);
+  Outbox(const Outbox&) = delete;
+  Outbox& operator=(const Outbox&) = delete;
+
+  // Reads what an earlier process left, and sends it.
+  void begin();
+  // Keeps the post, or not: `settled` is told once, when it is on disk (the post counts as outbox in the books then) or
+  // when it cannot be: on the caller's thread before this returns, or on the outbox's queue.
+  void keep(FailedPost post, Function<void(bool isKept)> settled);
+  // Whether there is hope that a post can be kept.
+  [[nodiscard]] bool isTaking() const EXCLUDES(mutex_);
+  // A first post to that address was taken.
+  void serverAnswers(std::string_view url) EXCLUDES(mutex_);
+  // What such an answer asks for.
+  [[nodiscard]] std::optional<Duration> pauseBy(const URLResponse* response) const {
+    return retryAfter(response, ports_.clock.timeOfDay());
+  }
+  [[nodiscard]] bool isEmpty() const { return size_.load(std::memory_order_relaxed) == 0; }
+
+  [[nodiscard]] std::vector<Server> list();
+  void flush();                                // sends without waiting for the time of the next try
+  [[nodiscard]] uint64_t drop(Filter filter);  // how many posts
+
+  // Shut-down: sends nothing any more, but goes on keeping.
+  void stopSending();
+  // Shut-down, its end: keeps what came, and closes the file. False when the disk takes longer.
+  [[nodiscard]] bool finishWithin(Duration patience);
+
+ private:
+  struct Incoming {
+    FailedPost failed;
+    Function<void(bool)> settled;
+  };
+  // A post on its way.
+  struct Sending {
+    int64_t number = 0;
+    ServerLine* line = nullptr;
+    std::string url;
+    size_t bytes = 0, bodyBytes = 0;
+    OutboxBooks::Events events;
+    std::shared_ptr<URLSession> session;
+    std::shared_ptr<URLTask> task;
+    bool isAbandoned = false;  // it has left the outbox meanwhile
+  };
+  struct Answer {
+    std::shared_ptr<Sending> sending;
+    PostVerdict verdict = PostVerdict::sendAgain;
+    std::optional<Duration> retryAfter;
+    bool isUnanswered = false, mayHaveLeft = true;
+  };
+  // What came from other threads since the last turn.
+  struct Inbox {
+    std::vector<Incoming> posts;
+    std::vector<Answer> answers;
+    std::vector<std::string> answering;  // servers
+    size_t bytes = 0;
+    bool connectivityChanged = false, flush = false;
+  };
+  // A change of the file, and of what is known of it, that happens as a whole or not.
+  struct Plan {
+    std::vector<Incoming> posts;
+    std::vector<int64_t> displaced;
+  };
+
+  Outbox(Ports ports, OutboxSettings settings);
+  void wake() EXCLUDES(mutex_);
+  void turn() REQUIRES(*queue_) EXCLUDES(mutex_);
+  void load() REQUIRES(*queue_);
+  [[nodiscard]] int64_t bornAt(int64_t keptAt) const;
+  [[nodiscard]] int64_t seconds() const;
+
+  void take(Answer& answer) REQUIRES(*queue_);
+  void tellOwner(const std::string& url, const OutboxBooks::Events& events, uint64_t bodyBytes,
+                 bool isAnswered);
+  void takeNews(const Inbox& inbox) REQUIRES(*queue_);
+  void fail(ServerLine& line, std::optional<Duration> pause, bool isUnanswered) REQUIRES(*queue_);
+  void pause(ServerLine& line, Duration length) REQUIRES(*queue_);
+  void hasten(ServerLine& line) REQUIRES(*queue_);
+  void forgetWithoutConsent() REQUIRES(*queue_);
+  void forgetTooOld() REQUIRES(*queue_);
+  void leave(KeptPosts::Entry& entry, Reason fate) REQUIRES(*queue_);
+  [[nodiscard]] OutboxBooks::Events eventsOf(int64_t number) REQUIRES(*queue_);
+
+  void keepAll(std::vector<Incoming> posts) REQUIRES(*queue_);
+  [[nodiscard]] bool makeRoom(Plan& plan, uint32_t user, uint64_t bytes) REQUIRES(*queue_);
+  void commit(Plan plan) REQUIRES(*queue_);
+  void kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced) REQUIRES(*queue_);
+  void notKept(Plan& plan) REQUIRES(*queue_);
+  void refuse(Incoming& post);
+  void handle(const PostStoreProblem& problem) REQUIRES(*queue_);
+
+  void sendWhatIsDue() REQUIRES(*queue_);
+  void sendFrom(ServerLine& line) REQUIRES(*queue_);
+  [[nodiscard]] bool send(KeptPosts::Entry& entry) REQUIRES(*queue_);
+  [[nodiscard]] std::shared_ptr<URLSession> sessionFor(ServerLine& line, const StoredPost& post)
+      REQUIRES(*queue_);
+  void setTimer() REQUIRES(*queue_);
+  void watchConnectivity() REQUIRES(*queue_);
+
+  // Constant.
+  const Ports ports_;
+  const OutboxSettings settings_;
+  const std::shared_ptr<SerialQueue> queue_;
+
+  // Self-synchronised.
+  std::atomic<size_t> size_{0};
+  std::atomic<bool> someFail_{false}, isStopping_{false};
+  mutable Mutex mutex_;
+  Inbox inbox_ GUARDED_BY(mutex_);
+  size_t bytesOnTheWay_ GUARDED_BY(mutex_) = 0;
+  bool isAwake_ GUARDED_BY(mutex_) = false;
+  MonotonicTime diskRestsUntil_ GUARDED_BY(mutex_){};
+
+  // The queue's.
+  KeptPosts posts_ GUARDED_BY(*queue_);
+  OutboxBooks books_ GUARDED_BY(*queue_);
+  std::map<int64_t, std::shared_ptr<Sending>> inFlight_ GUARDED_BY(*queue_);
+  size_t bytesInFlight_ GUARDED_BY(*queue_) = 0;
+  std::vector<int64_t> removed_ GUARDED_BY(*queue_);  // not yet from the file
+  bool removesForGood_ GUARDED_BY(*queue_) = false;
+  int64_t last_ GUARDED_BY(*queue_) = 0;
+  bool isLoaded_ GUARDED_BY(*queue_) = false, isWatching_ GUARDED_BY(*queue_) = false;
+  bool isClosed_ GUARDED_BY(*queue_) = false, isConsentGiven_ GUARDED_BY(*queue_) = false;
+  TimerHandle timer_ GUARDED_BY(*queue_);
+};
+
+}  // namespace kyt

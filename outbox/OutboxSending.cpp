@@ -1,0 +1,267 @@
+// How the outbox sends again: oldest first to each server, one at a time until one is taken, then some; after a failure it
+// waits, longer each time.
+#include <algorithm>
+#include <utility>
+
+#include "outbox/Outbox.h"
+#include "platform/RandomSource.h"
+#include "platform/base/Limits.h"
+#include "platform/queues/Log.h"
+
+namespace kyt {
+namespace {
+
+constexpr std::chrono::milliseconds kFirstPause = std::chrono::seconds(5);
+constexpr std::chrono::milliseconds kLongestPause = std::chrono::minutes(30);
+constexpr unsigned kMostDoublings = 9;
+// A network that comes and goes makes no server be asked more often than this.
+constexpr Duration kBetweenTries = std::chrono::seconds(5);
+
+}  // namespace
+
+// A random time up to a limit that doubles with each failure: devices that failed together do not come back together.
+void Outbox::fail(ServerLine& line, std::optional<Duration> length, bool isUnanswered) {
+  const MonotonicTime now = ports_.clock.monotonic();
+  line.isOpen = false;
+  line.isUnreachable = isUnanswered;
+  const unsigned doublings = std::min(line.failures, kMostDoublings);
+  const auto most = std::min(kFirstPause * (1U << doublings), kLongestPause);
+  const Duration random =
+      std::chrono::milliseconds(ports_.random.uniform(static_cast<uint32_t>(most.count()) + 1));
+  // Several that were on their way failed together: that is one failure.
+  const bool isAnother = line.failures == 0 || now >= line.nextTry;
+  if (isAnother) {
+    ++line.failures;
+    line.nextTry = now + random;
+  }
+  if (length) pause(line, *length);
+}
+
+void Outbox::pause(ServerLine& line, Duration length) {
+  line.notBefore = std::max(line.notBefore, ports_.clock.monotonic() + length);
+  line.nextTry = std::max(line.nextTry, line.notBefore);
+}
+
+// There is reason to try before the time has come.
+void Outbox::hasten(ServerLine& line) {
+  const MonotonicTime soonest =
+      std::max({ports_.clock.monotonic(), line.lastTry + kBetweenTries, line.notBefore});
+  line.nextTry = std::min(line.nextTry, soonest);
+}
+
+void Outbox::take(Answer& answer) {
+  Sending& sending = *answer.sending;
+  ServerLine& line = *sending.line;
+  --line.inFlight;
+  bytesInFlight_ -= sending.bytes;
+  for (ServerLine::Sender& sender : line.senders)
+    if (sender.session == sending.session) --sender.inFlight;
+  inFlight_.erase(sending.number);
+  if (answer.mayHaveLeft) tellOwner(sending.url, sending.events, sending.bodyBytes, !answer.isUnanswered);
+  KeptPosts::Entry* entry = sending.isAbandoned ? nullptr : posts_.find(sending.number);
+  if (entry == nullptr) return;
+  posts_.setInFlight(*entry, false);
+  if (answer.verdict == PostVerdict::sendAgain) {
+    if (!isStopping_) fail(line, answer.retryAfter, answer.isUnanswered);
+    return;
+  }
+  if (answer.verdict == PostVerdict::taken) {
+    if (line.failures > 1) ports_.log.normal("Outbox: %s takes posts again", line.server.c_str());
+    line.isOpen = true;
+    books_.deliver(sending.events);
+  } else {
+    const bool isRedirected = answer.verdict == PostVerdict::redirected;
+    ports_.counters.add(isRedirected ? Reason::requestRedirected : Reason::requestRefused);
+    books_.drop(sending.events, isRedirected ? Reason::postRedirected : Reason::postRefused);
+  }
+  removed_.push_back(sending.number);
+  posts_.remove(*entry);
+  if (answer.verdict == PostVerdict::braked) return fail(line, answer.retryAfter, false);
+  line.failures = 0;
+  line.nextTry = line.notBefore = ports_.clock.monotonic();
+}
+
+// The programs' parts of a message are as large as they have events.
+void Outbox::tellOwner(const std::string& url, const OutboxBooks::Events& events, uint64_t bodyBytes,
+                       bool isAnswered) {
+  uint64_t all = 0;
+  for (const auto& [row, count] : events) all += count;
+  for (const auto& [row, count] : events)
+    ports_.departures.add({.program = row.program,
+                           .server = std::string(serverOf(url)),
+                           .kind = DepartureKind::events,
+                           .events = count,
+                           .bytes = all != 0 ? bodyBytes * count / all : 0,
+                           .isAnswered = isAnswered});
+}
+
+void Outbox::takeNews(const Inbox& inbox) {
+  const MonotonicTime now = ports_.clock.monotonic();
+  for (const std::string& server : inbox.answering)
+    if (ServerLine* line = posts_.line(server)) hasten(*line);
+  if (!inbox.connectivityChanged && !inbox.flush) return;
+  for (auto& [server, line] : posts_.lines()) {
+    if (inbox.flush)
+      line.nextTry = line.notBefore = now;
+    else if (line.isUnreachable)
+      hasten(line);
+  }
+}
+
+// What left by an answer is off the disk before more is sent: so a process that is killed sends nothing twice but what was
+// on its way.
+void Outbox::sendWhatIsDue() {
+  if (isStopping_ || !isLoaded_ || !removed_.empty() || !isTaking()) return;
+  for (auto& [server, line] : posts_.lines()) sendFrom(line);
+}
+
+void Outbox::sendFrom(ServerLine& line) {
+  const size_t most = line.isOpen ? kMostAtATime : 1;
+  while (line.inFlight < most && ports_.clock.monotonic() >= line.nextTry) {
+    if (line.inFlight > 0 && bytesInFlight_ >= Limits::maxOutboxBytesInFlight) return;
+    KeptPosts::Entry* next = posts_.oldestOf(line);
+    if (next == nullptr || !send(*next)) return;
+  }
+}
+
+std::shared_ptr<URLSession> Outbox::sessionFor(ServerLine& line, const StoredPost& post) {
+  for (ServerLine::Sender& sender : line.senders) {
+    if (sender.identity != post.identity || sender.sourceApplication != post.sourceApplication) continue;
+    ++sender.inFlight;
+    return sender.session;
+  }
+  std::erase_if(line.senders, [](const ServerLine::Sender& sender) { return sender.inFlight == 0; });
+  URLSessionConfiguration configuration;
+  configuration.sourceApplication = post.sourceApplication;
+  std::shared_ptr<URLSession> session = ports_.network.create(std::move(configuration));
+  line.senders.push_back({post.identity, post.sourceApplication, session, 1});
+  return session;
+}
+
+bool Outbox::send(KeptPosts::Entry& entry) {
+  ServerLine& line = *entry.line;
+  auto read = ports_.store.read(entry.number);
+  if (const auto* problem = std::get_if<PostStoreProblem>(&read)) {
+    if (problem->kind != PostStoreProblem::Kind::post) {
+      handle(*problem);
+      return false;
+    }
+    ports_.log.error("Outbox: A post to %s is lost: %s", line.server.c_str(), problem->text.c_str());
+    removed_.push_back(entry.number);
+    posts_.remove(entry);
+    wake();
+    return false;
+  }
+  auto& post = std::get<StoredPost>(read);
+  auto sending = std::make_shared<Sending>();
+  sending->number = entry.number;
+  sending->line = &line;
+  sending->bytes = entry.bytes;
+  sending->bodyBytes = post.body.view().size();
+  sending->url = post.url;
+  sending->session = sessionFor(line, post);
+  sending->events = std::move(post.events);
+  URLRequest request;
+  request.method = "POST";
+  request.url = std::move(post.url);
+  request.headers = std::move(post.headers);
+  request.body = std::move(post.body);
+  request.allowsCellularAccess = post.allowsCellularAccess;
+  request.identity = std::move(post.identity);
+  request.neverWaits = true;  // the consent is asked before it leaves, whenever that is
+  posts_.setInFlight(entry, true);
+  inFlight_[sending->number] = sending;
+  ++line.inFlight;
+  bytesInFlight_ += sending->bytes;
+  line.lastTry = ports_.clock.monotonic();
+  sending->task = sending->session->start(
+      std::move(request), [weak = weak_from_this(), answeredSending = std::weak_ptr(sending)](
+                              const std::optional<Data>&, const std::optional<URLResponse>& response,
+                              const std::optional<Error>& error) {
+        const auto self = weak.lock();
+        auto answer = answeredSending.lock();
+        if (!self || !answer) return;
+        const URLResponse* answered = response ? &*response : nullptr;
+        {
+          MutexLock lock(self->mutex_);
+          self->inbox_.answers.push_back({std::move(answer), verdictOf(answered, error ? &*error : nullptr),
+                                          retryAfter(answered, self->ports_.clock.timeOfDay()),
+                                          answered == nullptr, mayHaveLeft(response, error)});
+        }
+        self->wake();
+      });
+  return true;
+}
+
+void Outbox::setTimer() {
+  timer_.cancel();
+  if (posts_.size() == 0 && removed_.empty() && isLoaded_) return;
+  const MonotonicTime now = ports_.clock.monotonic();
+  MonotonicTime next = now + kLongestRest;
+  if (!isTaking() || !isLoaded_ || !removed_.empty()) {
+    next = now + kDiskPause;
+  } else if (!isStopping_) {
+    for (const auto& [server, line] : posts_.lines())
+      if (line.posts != 0 && line.inFlight == 0) next = std::min(next, line.nextTry);
+  }
+  timer_ =
+      ports_.timers.after(std::max<Duration>(next - now, Duration(0)), queue_, [weak = weak_from_this()] {
+        if (const auto self = weak.lock()) {
+          self->queue_->assertCurrent();
+          self->turn();
+        }
+      });
+}
+
+void Outbox::watchConnectivity() {
+  bool someFail = false, someAreUnreachable = false;
+  for (const auto& [server, line] : posts_.lines()) {
+    someFail = someFail || (line.posts != 0 && line.failures != 0);
+    someAreUnreachable = someAreUnreachable || (line.posts != 0 && line.failures != 0 && line.isUnreachable);
+  }
+  someFail_.store(someFail, std::memory_order_relaxed);
+  const bool isWanted = someAreUnreachable && !isStopping_;
+  if (std::exchange(isWatching_, isWanted) == isWanted) return;
+  std::shared_ptr<Function<void()>> changed;
+  if (isWanted)
+    changed = std::make_shared<Function<void()>>([weak = weak_from_this()] {
+      const auto self = weak.lock();
+      if (!self) return;
+      {
+        MutexLock lock(self->mutex_);
+        self->inbox_.connectivityChanged = true;
+      }
+      self->wake();
+    });
+  ports_.network.watchConnectivity(std::move(changed));
+}
+
+void Outbox::stopSending() {
+  if (isStopping_.exchange(true)) return;
+  queue_->asyncBeside([self = shared_from_this()] {
+    self->queue_->assertCurrent();
+    for (auto& [number, sending] : self->inFlight_)
+      if (sending->task) sending->task->cancel();
+    self->watchConnectivity();
+  });
+}
+
+std::vector<Outbox::Server> Outbox::list() {
+  return queue_->sync([this] {
+    queue_->assertCurrent();
+    const MonotonicTime now = ports_.clock.monotonic();
+    std::map<const ServerLine*, int64_t> oldest;
+    for (const KeptPosts::Entry& entry : posts_.entries())
+      if (!entry.isGone) oldest.emplace(entry.line, entry.born);
+    std::vector<Server> servers;
+    for (const auto& [name, line] : posts_.lines()) {
+      if (line.posts == 0) continue;
+      servers.push_back({name, line.posts, line.bytes, line.inFlight, line.failures,
+                         std::chrono::seconds(seconds() - oldest[&line]),
+                         std::max(Duration(0), line.inFlight == 0 ? line.nextTry - now : Duration(0))});
+    }
+    return servers;
+  });
+}
+
+}  // namespace kyt

@@ -1,0 +1,74 @@
+// Posts on disk, for the outbox alone: what could not be sent is kept here with all that sending it again needs, byte for
+// byte. The real one is SQLite (platform/linux/outbox/SQLitePostStore.h).
+//
+// One thread at a time; every operation may block as long as the disk likes. A change is there as a whole or not at all,
+// and when change() has returned well it outlives a loss of power.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+#include <utility>
+#include <variant>
+#include <vector>
+
+#include "platform/base/Books.h"
+#include "platform/base/Function.h"
+#include "platform/objects/Value.h"
+
+namespace kyt {
+
+inline constexpr uint32_t kNoUser = ~uint32_t{0};  // the daemon's own post
+
+struct StoredPost {
+  int64_t number = 0;        // from 1, in the order in which they were kept
+  int64_t keptAt = 0;        // seconds since 1970; 0: the clock had not been set
+  uint32_t user = kNoUser;   // whose share it counts towards
+  bool isByConsent = false;  // see URLRequest
+  bool allowsCellularAccess = true;
+  std::string url, identity, sourceApplication;
+  std::vector<std::pair<std::string, std::string>> headers;
+  std::vector<BookedEvents::OfRow> events;
+  Data body;
+};
+
+// What is known of a post without reading its body.
+struct StoredPostHead {
+  StoredPost post;  // without headers and body
+  uint64_t bytes = 0;
+};
+
+struct PostStoreProblem {
+  // Unavailable: a full or missing disk, a missing library; another time may do better. Post: that one cannot be read any
+  // more, all others can. Damaged: none can be, and setAside() gives a new beginning.
+  enum class Kind { unavailable, post, damaged };
+  Kind kind = Kind::unavailable;
+  std::string text;
+};
+
+class PostStore {
+ public:
+  // Address, headers and body: what the outbox's limits count.
+  [[nodiscard]] static uint64_t bytesOf(const StoredPost& post) {
+    uint64_t bytes = post.url.size() + post.body.view().size();
+    for (const auto& [name, value] : post.headers) bytes += name.size() + value.size();
+    return bytes;
+  }
+
+  virtual ~PostStore() = default;
+  // Before all else: calls `found` with each post, oldest first. A store that was never written to is not made by this.
+  [[nodiscard]] virtual std::optional<PostStoreProblem> open(Function<void(StoredPostHead)> found) = 0;
+  // Adds and removes; numbers that are not there are removed already. `forGood`: what is removed is overwritten too.
+  [[nodiscard]] virtual std::optional<PostStoreProblem> change(std::span<const StoredPost* const> added,
+                                                               std::span<const int64_t> removed,
+                                                               bool forGood) = 0;
+  [[nodiscard]] virtual std::variant<StoredPost, PostStoreProblem> read(int64_t number) = 0;
+  // Nothing is left in it: it may give its room back to the disk.
+  virtual void becameEmpty() = 0;
+  // What is there is put beside, for a person to look at, and the next change begins anew. Its text: what was done.
+  [[nodiscard]] virtual std::string setAside() = 0;
+  virtual void close() = 0;
+};
+
+}  // namespace kyt

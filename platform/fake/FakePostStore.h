@@ -1,0 +1,63 @@
+// Posts in memory, as a disk that survives the objects that use it: a test makes another store on the same disk for another
+// process. One thread at a time.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/PostStore.h"
+
+namespace kyt {
+
+class FakePostStore final : public PostStore {
+ public:
+  struct Disk {
+    std::map<int64_t, StoredPost> posts;
+    std::optional<PostStoreProblem> problem;  // what every operation meets
+    size_t changes = 0, setAside = 0;
+    bool wasForGood = false;  // the last change
+  };
+  explicit FakePostStore(std::shared_ptr<Disk> disk) : disk_(std::move(disk)) {}
+
+  [[nodiscard]] std::optional<PostStoreProblem> open(Function<void(StoredPostHead)> found) override {
+    if (disk_->problem) return disk_->problem;
+    for (const auto& [number, post] : disk_->posts) {
+      StoredPostHead head{post, bytesOf(post)};
+      head.post.headers.clear();
+      head.post.body = {};
+      found(std::move(head));
+    }
+    return std::nullopt;
+  }
+  [[nodiscard]] std::optional<PostStoreProblem> change(std::span<const StoredPost* const> added,
+                                                       std::span<const int64_t> removed,
+                                                       bool forGood) override {
+    if (disk_->problem) return disk_->problem;
+    for (const int64_t number : removed) disk_->posts.erase(number);
+    for (const StoredPost* post : added) disk_->posts[post->number] = *post;
+    ++disk_->changes;
+    disk_->wasForGood = forGood;
+    return std::nullopt;
+  }
+  [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override {
+    if (disk_->problem) return *disk_->problem;
+    const auto known = disk_->posts.find(number);
+    if (known == disk_->posts.end()) return PostStoreProblem{PostStoreProblem::Kind::post, "missing"};
+    return known->second;
+  }
+  void becameEmpty() override {}
+  [[nodiscard]] std::string setAside() override {
+    ++disk_->setAside;
+    disk_->posts.clear();
+    disk_->problem.reset();
+    return "set aside";
+  }
+  void close() override {}
+
+ private:
+  const std::shared_ptr<Disk> disk_;
+};
+
+}  // namespace kyt

@@ -1,0 +1,303 @@
+// The outbox on a real file whose disk fails: each call of the system that SQLite makes fails in turn, and a process is
+// killed in the middle of whatever it does.
+#include <dlfcn.h>
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <set>
+
+#include "outbox/Outbox.h"
+#include "outbox/OutboxURLSession.h"
+#include "platform/linux/outbox/SQLitePostStore.h"
+#include "tests/support/TemporaryFolder.h"
+#include "tests/support/TestPlatform.h"
+
+namespace {
+
+// Which call of which name fails, and how: from that one on, so many.
+struct Fault {
+  std::string call;
+  int after = -1;  // negative: none fails
+  int times = 1;
+  int error = EIO;
+  long seen = 0;
+  bool fails(const char* name) {
+    if (call != name) return false;
+    const long number = seen++;
+    if (after < 0 || number < after || number >= after + times) return false;
+    errno = error;
+    return true;
+  }
+} fault;
+
+}  // namespace
+
+// SQLite finds these before the C library's.
+extern "C" {
+int fdatasync(int descriptor) {
+  static auto* const real = reinterpret_cast<int (*)(int)>(::dlsym(RTLD_NEXT, "fdatasync"));
+  return fault.fails("fdatasync") ? -1 : real(descriptor);
+}
+int fsync(int descriptor) {
+  static auto* const real = reinterpret_cast<int (*)(int)>(::dlsym(RTLD_NEXT, "fsync"));
+  return fault.fails("fsync") ? -1 : real(descriptor);
+}
+}
+
+namespace kyt {
+namespace {
+
+sqlite3_syscall_ptr real(const char* name) {
+  static std::map<std::string, sqlite3_syscall_ptr> known;
+  auto [entry, isNew] = known.try_emplace(name);
+  if (isNew) entry->second = sqlite3_vfs_find(nullptr)->xGetSystemCall(sqlite3_vfs_find(nullptr), name);
+  return entry->second;
+}
+int failingOpen(const char* path, int flags, int mode) {
+  if (fault.fails("open")) return -1;
+  return reinterpret_cast<int (*)(const char*, int, int)>(real("open"))(path, flags, mode);
+}
+ssize_t failingWrite(int descriptor, const void* bytes, size_t size, off_t at) {
+  if (fault.fails("pwrite64")) return -1;
+  return reinterpret_cast<ssize_t (*)(int, const void*, size_t, off_t)>(real("pwrite64"))(descriptor, bytes,
+                                                                                          size, at);
+}
+ssize_t failingRead(int descriptor, void* bytes, size_t size, off_t at) {
+  if (fault.fails("pread64")) return -1;
+  return reinterpret_cast<ssize_t (*)(int, void*, size_t, off_t)>(real("pread64"))(descriptor, bytes, size,
+                                                                                   at);
+}
+int failingTruncate(int descriptor, off_t size) {
+  if (fault.fails("ftruncate")) return -1;
+  return reinterpret_cast<int (*)(int, off_t)>(real("ftruncate"))(descriptor, size);
+}
+int failingStat(int descriptor, struct stat* status) {
+  if (fault.fails("fstat")) return -1;
+  return reinterpret_cast<int (*)(int, struct stat*)>(real("fstat"))(descriptor, status);
+}
+int failingUnlink(const char* path) {
+  if (fault.fails("unlink")) return -1;
+  return reinterpret_cast<int (*)(const char*)>(real("unlink"))(path);
+}
+
+constexpr const char* kCalls[] = {"open",  "pwrite64", "pread64",   "ftruncate",
+                                  "fstat", "unlink",   "fdatasync", "fsync"};
+
+void makeCallsFail() {
+  sqlite3_vfs* system = sqlite3_vfs_find(nullptr);
+  const std::pair<const char*, sqlite3_syscall_ptr> table[] = {
+      {"open", reinterpret_cast<sqlite3_syscall_ptr>(failingOpen)},
+      {"pwrite64", reinterpret_cast<sqlite3_syscall_ptr>(failingWrite)},
+      {"pread64", reinterpret_cast<sqlite3_syscall_ptr>(failingRead)},
+      {"ftruncate", reinterpret_cast<sqlite3_syscall_ptr>(failingTruncate)},
+      {"fstat", reinterpret_cast<sqlite3_syscall_ptr>(failingStat)},
+      {"unlink", reinterpret_cast<sqlite3_syscall_ptr>(failingUnlink)}};
+  for (const auto& [name, replacement] : table) {
+    static_cast<void>(real(name));
+    ASSERT_EQ(system->xSetSystemCall(system, name, replacement), SQLITE_OK) << name;
+  }
+}
+
+class OutboxDiskTest : public testing::Test {
+ protected:
+  OutboxDiskTest() {
+    test_.clock.setTimeOfDay({1767225600, 0});
+    test_.random.setDraw(4999);  // ms: nobody tries again at once
+  }
+  ~OutboxDiskTest() override { fault = Fault(); }
+
+  void start() {
+    store_ = std::make_unique<SQLitePostStore>(folder_.path());
+    outbox_ =
+        Outbox::create({test_.clock, test_.timers, test_.random, test_.executor, test_.consent,
+                        test_.counters, test_.log, *books_, test_.departures, test_.urlSessions, *store_},
+                       OutboxSettings{.enabled = true});
+    factory_ = std::make_unique<OutboxURLSessionFactory>(test_.urlSessions, outbox_, test_.executor);
+    session_ = factory_->create({});
+    outbox_->begin();
+    test_.executor.runAll();
+  }
+  void stop() {
+    outbox_->stopSending();
+    test_.executor.runAll();
+    session_.reset();
+    factory_.reset();
+    outbox_.reset();
+    store_.reset();
+  }
+  // Fails unless the server is up; `taken` has what it took. Returns whether the session was told that it was taken.
+  void post(int number) {
+    const auto tally = books_->open({1000, 7, "a", "b"}, "httppost", false);
+    tally->take();
+    BookedEvents booked;
+    booked.add(tally.get());
+    auto posted = std::make_shared<PostedEvents>(std::move(booked), test_.counters);
+    URLRequest request;
+    request.method = "POST";
+    request.url = "https://events.example.org/v1";
+    request.body = Data(std::to_string(number) + " " + std::string(3000, 'x'));
+    request.events = posted->events();
+    session_->start(std::move(request), [this, number, posted](auto, auto response, auto error) {
+      if (!error && !response) kept_.insert(number);
+      if (error)
+        posted->dropped(Reason::postFailed);
+      else
+        posted->delivered();
+    });
+    test_.executor.runAll();
+  }
+  void answerEverything(bool isUp) {
+    test_.urlSessions.setResponder([this, isUp](const URLRequest& request) {
+      FakeURLSessionFactory::Reply reply;
+      if (isUp)
+        ++taken_[std::atoi(std::string(request.body.view()).c_str())];
+      else
+        reply.error = Error{kKYTURLErrorDomain, 28, "time-out"};
+      return std::optional(std::move(reply));
+    });
+  }
+  void pass(Duration time) {
+    test_.timers.advance(time, [this] { test_.executor.runAll(); });
+  }
+  [[nodiscard]] BookRow row() const {
+    for (BookRow& row : books_->snapshot()) return std::move(row);
+    return {};
+  }
+
+  TestPlatform test_;
+  TemporaryFolder folder_;
+  std::unique_ptr<Books> books_ = std::make_unique<Books>();
+  std::unique_ptr<SQLitePostStore> store_;
+  std::shared_ptr<Outbox> outbox_;
+  std::unique_ptr<OutboxURLSessionFactory> factory_;
+  std::unique_ptr<URLSession> session_;
+  std::set<int> kept_;
+  std::map<int, int> taken_;
+};
+
+// Whatever fails: nobody crashes, each event is in one place of the books, and what was said to be kept arrives.
+TEST_F(OutboxDiskTest, ClosesItsBooksWhicheverCallOfTheSystemFails) {
+  makeCallsFail();
+  int runs = 0, failures = 0;
+  for (const char* call : kCalls) {
+    for (const int error : {EIO, ENOSPC}) {
+      for (int after = 0; after < 40; after += after < 8 ? 1 : 8) {
+        for (const int times : {1, 1000000}) {
+          std::filesystem::remove_all(folder_.path());
+          std::filesystem::create_directory(folder_.path());
+          books_ = std::make_unique<Books>();
+          kept_.clear();
+          taken_.clear();
+          fault = {call, after, times, error, 0};
+          answerEverything(false);
+          start();
+          for (int i = 0; i < 6; ++i) {
+            post(i);
+            if (i == 3) pass(std::chrono::seconds(31));
+          }
+          const long seen = fault.seen;
+          fault = Fault();
+          answerEverything(true);
+          pass(std::chrono::hours(2));
+          const BookRow books = row();
+          ASSERT_EQ(books.taken, 6U);
+          EXPECT_EQ(books.queued + books.batched + books.inFlight + books.waiting + books.outbox, 0U)
+              << call << " " << after << " " << describeRow(books);
+          if (books.droppedFor(Reason::outboxUnreadable) == 0) {
+            for (const int number : kept_)
+              EXPECT_GE(taken_[number], 1)
+                  << call << " " << after << " " << number << " " << describeRow(books);
+          }
+          stop();
+          ++runs;
+          failures += seen > after ? 1 : 0;
+        }
+      }
+    }
+  }
+  std::printf("%d runs, in %d of which the call failed\n", runs, failures);
+  EXPECT_GT(failures, 100);
+}
+
+// A child process keeps posts and forgets them, telling each on a pipe when it is sure; it is killed at any moment.
+void keepAndForget(const std::string& folder, int pipe) {
+  SQLitePostStore store(folder);
+  int64_t next = 1;
+  std::vector<int64_t> there;
+  if (store.open([&](const StoredPostHead& head) {
+        there.push_back(head.post.number);
+        next = head.post.number + 1;
+      }))
+    ::_exit(3);
+  for (unsigned turn = 0;; ++turn) {
+    StoredPost post;
+    post.number = next++;
+    post.url = "https://events.example.org";
+    post.body = Data(std::string(500 + static_cast<size_t>(post.number) * 37 % 9000, 'x'));
+    const StoredPost* added = &post;
+    std::vector<int64_t> removed;
+    if (there.size() > 20 || (turn % 3 == 0 && !there.empty())) {
+      removed.push_back(there.front());
+      there.erase(there.begin());
+    }
+    // What is about to be forgotten may be gone; what is kept is sure afterwards.
+    for (const int64_t number : removed) {
+      const int64_t told = -number;
+      if (::write(pipe, &told, sizeof told) != sizeof told) ::_exit(4);
+    }
+    if (store.change({&added, 1}, removed, false)) ::_exit(5);
+    there.push_back(post.number);
+    if (::write(pipe, &post.number, sizeof post.number) != sizeof post.number) ::_exit(4);
+  }
+}
+
+TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilled) {
+  const char* wanted = std::getenv("KYT_OUTBOX_KILLS");
+  const int kills = wanted != nullptr ? std::atoi(wanted) : 20;
+  std::set<int64_t> sure;
+  size_t seen = 0;
+  for (int kill = 0; kill < kills; ++kill) {
+    int ends[2];
+    ASSERT_EQ(::pipe(ends), 0);
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      ::close(ends[0]);
+      keepAndForget(folder_.path(), ends[1]);
+    }
+    ::close(ends[1]);
+    const unsigned most = 1 + static_cast<unsigned>(std::rand()) % 60;
+    int64_t told = 0;
+    for (unsigned i = 0; i < most && ::read(ends[0], &told, sizeof told) == sizeof told; ++i)
+      told > 0 ? static_cast<void>(sure.insert(told)) : static_cast<void>(sure.erase(-told));
+    ::usleep(static_cast<unsigned>(std::rand()) % 3000);
+    ::kill(child, SIGKILL);
+    while (::read(ends[0], &told, sizeof told) == sizeof told)
+      told > 0 ? static_cast<void>(sure.insert(told)) : static_cast<void>(sure.erase(-told));
+    ::close(ends[0]);
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(status)) << "it ended by itself: " << WEXITSTATUS(status);
+    SQLitePostStore store(folder_.path());
+    std::set<int64_t> there;
+    const auto problem = store.open([&](const StoredPostHead& head) { there.insert(head.post.number); });
+    ASSERT_FALSE(problem) << problem->text;
+    for (const int64_t number : sure) {
+      ASSERT_TRUE(there.contains(number)) << number << " of kill " << kill;
+      ASSERT_TRUE(std::holds_alternative<StoredPost>(store.read(number)));
+      ++seen;
+    }
+    sure = there;
+  }
+  EXPECT_GT(seen, 0U);
+}
+
+}  // namespace
+}  // namespace kyt

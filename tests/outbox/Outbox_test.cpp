@@ -1,0 +1,504 @@
+#include "outbox/Outbox.h"
+
+#include "platform/base/Limits.h"
+#include "tests/outbox/OutboxFixture.h"
+
+namespace kyt {
+namespace {
+
+using std::chrono::hours;
+using std::chrono::milliseconds;
+using std::chrono::minutes;
+using std::chrono::seconds;
+
+class OutboxTest : public OutboxFixture {
+ protected:
+  // After many failures until shortly before half an hour has passed.
+  void waitLong() { test_.random.setDraw(1799999); }
+  [[nodiscard]] std::vector<std::string> openBodies() const {
+    std::vector<std::string> bodies;
+    for (size_t i = 0; i < network_->requestCount(); ++i)
+      if (network_->isOpen(i)) bodies.push_back(body(i));
+    return bodies;
+  }
+  void keepNumbered(int posts, std::string_view url = "") {
+    for (int i = 0; i < posts; ++i) postAndKeep(std::to_string(i), 1000, url);
+  }
+  [[nodiscard]] size_t sent() const { return network_->requestCount(); }
+};
+
+TEST_F(OutboxTest, SendsTheOldestFirstAndOneAtATimeUntilOneIsTakenThenFour) {
+  start();
+  keepNumbered(12);
+  EXPECT_TRUE(openBodies().empty());
+  pass(seconds(5));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"0"}));
+  answer(last(), 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1", "2", "3", "4"}));
+  answer(last(), 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1", "2", "3", "5"}));
+  for (size_t i = 0; i < sent(); ++i)
+    if (network_->isOpen(i)) answer(i, 503);
+  EXPECT_TRUE(openBodies().empty()) << "it waits again";
+  pass(minutes(1));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+}
+
+TEST_F(OutboxTest, WaitsForARandomTimeUpToALimitThatDoublesUpToHalfAnHour) {
+  start();
+  waitLong();
+  postAndKeep();
+  std::vector<uint32_t> most;
+  for (int failure = 0; failure < 12; ++failure) {
+    const size_t before = sent();
+    most.push_back(test_.random.bounds().back() - 1);
+    test_.random.setDraw(most.back());
+    pass(milliseconds(1800001));
+    ASSERT_EQ(sent(), before + 1) << failure;
+    fail(last());
+  }
+  EXPECT_EQ(most, std::vector<uint32_t>({5000, 10000, 20000, 40000, 80000, 160000, 320000, 640000, 1280000,
+                                         1800000, 1800000, 1800000}));
+}
+
+TEST_F(OutboxTest, LeavesAServerAloneForAsLongAsItAsksButNoLongerThanADay) {
+  start();
+  static_cast<void>(post());
+  answer(last(), 429, {{"Retry-After", "31536000"}});
+  pass(hours(24) - seconds(1));
+  EXPECT_EQ(sent(), 1U);
+  pass(seconds(2));
+  ASSERT_EQ(sent(), 2U);
+  answer(last(), 503, {{"Retry-After", "7200"}});
+  network_->changeConnectivity();
+  pass(seconds(7190));
+  EXPECT_EQ(sent(), 2U);
+  pass(seconds(20));
+  EXPECT_EQ(sent(), 3U);
+}
+
+TEST_F(OutboxTest, LosesOnlyThePostThatAServerRefusesForGood) {
+  start();
+  keepNumbered(3);
+  pass(seconds(5));
+  answer(last(), 413);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+  answer(last(), 302);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"2"}));
+  answer(last(), 501);
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_EQ(row().droppedFor(Reason::postRefused), 4U);
+  EXPECT_EQ(row().droppedFor(Reason::postRedirected), 2U);
+  EXPECT_EQ(row().outbox, 0U);
+}
+
+TEST_F(OutboxTest, HoldsTheLineBackWhenTheOperatorBrakes) {
+  start();
+  waitLong();
+  keepNumbered(3);
+  pass(seconds(6));
+  answer(last(), 501);
+  EXPECT_TRUE(openBodies().empty());
+  pass(minutes(1));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+}
+
+TEST_F(OutboxTest, LetsNoServerWaitForAnother) {
+  start();
+  postAndKeep("hangs", 1000, "https://hangs.example.org/v1");
+  postAndKeep("good", 1000, "https://good.example.org/v1");
+  postAndKeep("busy", 1000, "https://busy.example.org/v1");
+  pass(seconds(5));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"busy", "good", "hangs"}));
+  for (size_t i = 0; i < sent(); ++i)
+    if (network_->isOpen(i) && body(i) == "busy") answer(i, 429, {{"Retry-After", "100000"}});
+  postAndKeep("good 2", 1000, "https://good.example.org/v1");
+  for (size_t i = 0; i < sent(); ++i)
+    if (network_->isOpen(i) && body(i) == "good") answer(i, 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"hangs", "good 2"}));
+}
+
+TEST_F(OutboxTest, GoesOnAtOnceWhenConnectivityReturns) {
+  start();
+  waitLong();
+  postAndKeep();
+  for (int i = 0; i < 12; ++i) {
+    pass(minutes(31));
+    fail(last());
+  }
+  const size_t before = sent();
+  pass(seconds(10));
+  ASSERT_EQ(sent(), before);
+  EXPECT_TRUE(network_->isWatched());
+  network_->changeConnectivity();
+  drain();
+  ASSERT_EQ(sent(), before + 1);
+  answer(last(), 200);
+  EXPECT_FALSE(network_->isWatched());
+}
+
+TEST_F(OutboxTest, AsksNoServerMoreThanOnceInFiveSecondsHoweverOftenConnectivityReturns) {
+  start();
+  waitLong();
+  postAndKeep();
+  pass(seconds(6));
+  for (int i = 0; i < 4; ++i) {
+    pass(minutes(10));
+    fail(last());
+  }
+  const size_t before = sent();
+  for (int i = 0; i < 100; ++i) {
+    network_->changeConnectivity();
+    drain();
+    if (network_->isOpen(last())) fail(last());
+    pass(milliseconds(100));
+  }
+  EXPECT_LE(sent() - before, 3U);
+}
+
+TEST_F(OutboxTest, GoesOnWhenTheServerTakesANewPost) {
+  start();
+  waitLong();
+  postAndKeep("old");
+  for (int i = 0; i < 6; ++i) {
+    pass(minutes(31));
+    answer(last(), 503);
+  }
+  pass(seconds(6));
+  static_cast<void>(post("new"));
+  answer(last(), 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"old"}));
+}
+
+TEST_F(OutboxTest, SendsPostsOfTwoIdentitiesThroughSessionsOfTheirOwn) {
+  start();
+  postAndKeep("a");
+  URLRequest request = network_->lastRequest();
+  request.identity = "another";
+  request.events = std::make_shared<const BookedEvents>();
+  session_->start(std::move(request), [](auto, auto, auto) {});
+  fail(last());
+  postAndKeep("c");
+  pass(seconds(5));
+  answer(last(), 200);
+  ASSERT_EQ(sent(), 6U);
+  EXPECT_NE(network_->sessionOf(3), network_->sessionOf(4));
+  EXPECT_NE(network_->sessionOf(4), network_->sessionOf(5));
+}
+
+TEST_F(OutboxTest, LosesTheOldestOfAUserWhoseShareIsFull) {
+  settings_.maxBytesPerUser = 3000;
+  start();
+  postAndKeep("other", 2000);
+  for (int i = 0; i < 5; ++i) postAndKeep(std::string(900, static_cast<char>('a' + i)));
+  EXPECT_EQ(disk_->posts.size(), 4U);
+  EXPECT_EQ(row(1000).droppedFor(Reason::outboxDisplaced), 4U);
+  EXPECT_EQ(row(1000).outbox, 6U);
+  EXPECT_EQ(row(2000).outbox, 2U);
+  EXPECT_EQ(disk_->posts.rbegin()->second.body.view().front(), 'e');
+}
+
+TEST_F(OutboxTest, LosesTheOldestOfAllWhenItIsFull) {
+  settings_.maxBytes = 3000;
+  start();
+  for (uint32_t i = 0; i < 5; ++i) postAndKeep(std::string(900, 'x'), 1000 + i);
+  EXPECT_EQ(row(1000).droppedFor(Reason::outboxDisplaced), 2U);
+  EXPECT_EQ(row(1001).droppedFor(Reason::outboxDisplaced), 2U);
+  EXPECT_EQ(row(1004).outbox, 2U);
+}
+
+TEST_F(OutboxTest, DisplacesNothingForAPostThatTheDiskDoesNotTake) {
+  settings_.maxBytes = 3000;
+  start();
+  for (uint32_t i = 0; i < 3; ++i) postAndKeep(std::string(900, 'x'), 1000 + i);
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "disk full"};
+  const auto outcome = post(std::string(900, 'x'), 1003);
+  answer(last(), 503);
+  EXPECT_EQ(outcome->response->status, 503);
+  disk_->problem.reset();
+  EXPECT_EQ(disk_->posts.size(), 3U);
+  EXPECT_EQ(row(1000).outbox, 2U);
+  pass(minutes(31));
+  EXPECT_EQ(openBodies().size(), 1U);
+}
+
+TEST_F(OutboxTest, KeepsNoPostLargerThanItsBounds) {
+  settings_.maxBytesPerUser = 3000;
+  start();
+  const auto outcome = post(std::string(3000, 'x'));
+  answer(last(), 503);
+  EXPECT_EQ(outcome->response->status, 503);
+  EXPECT_EQ(test_.counters.value(Reason::postNotKept), 1U);
+}
+
+TEST_F(OutboxTest, LosesWhatNobodyTookInTime) {
+  start();
+  postAndKeep("old");
+  for (int day = 0; day < 13; ++day) {
+    pass(hours(24));
+    if (network_->isOpen(last())) fail(last());
+  }
+  postAndKeep("young");
+  pass(hours(25));
+  EXPECT_EQ(row().droppedFor(Reason::outboxTooOld), 2U);
+  EXPECT_EQ(disk_->posts.size(), 1U);
+}
+
+TEST_F(OutboxTest, CountsAgeOverARestartAndMakesNothingOldByAClockThatJumps) {
+  start();
+  postAndKeep("first");
+  stop();
+  test_.clock.setTimeOfDay({1767225600 + 13 * 86400, 0});
+  start();
+  EXPECT_EQ(row().outbox, 2U);
+  stop();
+  test_.clock.setTimeOfDay({1767225600 + 15 * 86400, 0});
+  start();
+  EXPECT_EQ(row().droppedFor(Reason::outboxTooOld), 2U);
+  EXPECT_TRUE(disk_->posts.empty());
+  test_.clock.setTimeOfDay({100, 0});
+  postAndKeep("while the clock was not set");
+  test_.clock.setTimeOfDay({1767225600, 0});
+  pass(seconds(1));
+  EXPECT_EQ(disk_->posts.size(), 1U);
+  restart();
+  EXPECT_EQ(disk_->posts.size(), 1U);
+}
+
+TEST_F(OutboxTest, BooksWhatLayInItAtTheStart) {
+  start();
+  postAndKeep("a", 1000);
+  postAndKeep("b", 2000);
+  restart();
+  EXPECT_EQ(row(1000).taken, 2U);
+  EXPECT_EQ(row(1000).outbox, 2U);
+  EXPECT_EQ(row(2000).outbox, 2U);
+  EXPECT_EQ(row(1000).program, (ReportingProgram{1000, 7, "videocall", "call"}));
+  pass(seconds(5));
+  answer(last(), 200);
+  EXPECT_EQ(row(1000).delivered, 2U);
+  EXPECT_EQ(row(1000).outbox, 0U);
+}
+
+TEST_F(OutboxTest, DeletesWhatWasCollectedByConsentBeforeAnythingElseLeaves) {
+  start();
+  isByConsent_ = true;
+  keepNumbered(2);
+  isByConsent_ = false;
+  postAndKeep("without");
+  const size_t before = sent();
+  test_.consent.setAllowed(false);
+  pass(seconds(5));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"without"}));
+  EXPECT_EQ(sent(), before + 1);
+  EXPECT_TRUE(disk_->posts.size() == 1);
+  EXPECT_EQ(row().droppedFor(Reason::outboxConsentWithdrawn), 4U);
+}
+
+TEST_F(OutboxTest, DeletesWhatWasCollectedByAConsentThatWentWhileTheDaemonDidNotRun) {
+  start();
+  isByConsent_ = true;
+  postAndKeep("by consent");
+  stop();
+  test_.consent.setAllowed(false);
+  start();
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_TRUE(disk_->wasForGood);
+  EXPECT_EQ(row().droppedFor(Reason::outboxConsentWithdrawn), 2U);
+  pass(hours(1));
+  EXPECT_EQ(sent(), 0U);
+}
+
+TEST_F(OutboxTest, CancelsWhatIsOnItsWayWhenTheConsentGoes) {
+  start();
+  isByConsent_ = true;
+  postAndKeep("by consent");
+  pass(seconds(5));
+  ASSERT_EQ(openBodies().size(), 1U);
+  test_.consent.setAllowed(false);
+  pass(Outbox::kLongestRest);
+  EXPECT_TRUE(openBodies().empty());
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_TRUE(outbox_->isEmpty());
+}
+
+TEST_F(OutboxTest, KeepsNothingThatWasCollectedByAConsentThatIsGone) {
+  start();
+  isByConsent_ = true;
+  const auto outcome = post();
+  test_.consent.setAllowed(false);
+  answer(last(), 503);
+  EXPECT_EQ(outcome->response->status, 503);
+  EXPECT_TRUE(disk_->posts.empty());
+}
+
+TEST_F(OutboxTest, SetsADamagedFileAsideAndGoesOn) {
+  start();
+  postAndKeep("lost");
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::damaged, "malformed"};
+  pass(seconds(5));
+  EXPECT_EQ(disk_->setAside, 1U);
+  EXPECT_EQ(test_.counters.value(Reason::outboxFileDamaged), 1U);
+  EXPECT_EQ(row().droppedFor(Reason::outboxUnreadable), 2U);
+  postAndKeep("kept");
+  EXPECT_EQ(disk_->posts.size(), 1U);
+  EXPECT_EQ(row().outbox, 2U);
+}
+
+TEST_F(OutboxTest, LosesOnlyThePostThatCannotBeRead) {
+  start();
+  keepNumbered(2);
+  disk_->posts.erase(disk_->posts.begin());
+  pass(seconds(10));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+  answer(last(), 200);
+  EXPECT_EQ(row().outbox, 0U);
+  EXPECT_EQ(row().droppedFor(Reason::outboxUnreadable), 2U);
+  EXPECT_EQ(row().delivered, 2U);
+}
+
+TEST_F(OutboxTest, ReadsItsFileLaterWhenTheDiskDoesNotAnswerAtTheStart) {
+  start();
+  postAndKeep("kept");
+  stop();
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "not mounted"};
+  start();
+  EXPECT_TRUE(outbox_->isEmpty());
+  disk_->problem.reset();
+  pass(Outbox::kDiskPause + seconds(6));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxTest, SendsNothingMoreWhileTheDiskCannotForgetWhatWasTaken) {
+  start();
+  keepNumbered(2);
+  pass(seconds(5));
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read only"};
+  answer(last(), 200);
+  EXPECT_TRUE(openBodies().empty());
+  disk_->problem.reset();
+  pass(Outbox::kDiskPause);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+  EXPECT_EQ(disk_->posts.size(), 1U);
+}
+
+TEST_F(OutboxTest, TakesNoMoreThanFitsInMemoryWhileTheDiskIsSlow) {
+  settings_.maxBytesPerUser = settings_.maxBytes;
+  start();
+  std::vector<std::shared_ptr<Outcome>> outcomes;
+  for (int i = 0; i < 10; ++i) outcomes.push_back(post(std::string(1 << 20, 'x')));
+  for (size_t i = 0; i < outcomes.size(); ++i) network_->complete(i, 503);
+  drain();
+  size_t kept = 0;
+  for (const auto& outcome : outcomes) kept += outcome->response ? 0 : 1;
+  EXPECT_EQ(kept, (Limits::maxBytesOnTheWayToTheOutbox >> 20) - 1);
+  EXPECT_EQ(test_.counters.value(Reason::postNotKept), outcomes.size() - kept);
+}
+
+TEST_F(OutboxTest, PutsWhatFailsTogetherOnTheDiskTogether) {
+  start();
+  for (int i = 0; i < 50; ++i) static_cast<void>(post(std::to_string(i)));
+  for (size_t i = 0; i < 50; ++i) network_->complete(i, 503);
+  drain();
+  EXPECT_EQ(disk_->posts.size(), 50U);
+  EXPECT_LE(disk_->changes, 2U);
+}
+
+TEST_F(OutboxTest, ListsSendsAndDropsForTheAdministrator) {
+  start();
+  waitLong();
+  postAndKeep("a", 1000, "https://one.example.org/x");
+  postAndKeep("b", 2000, "https://two.example.org/x");
+  pass(seconds(1));
+  const auto servers = outbox_->list();
+  ASSERT_EQ(servers.size(), 2U);
+  EXPECT_EQ(servers[0].server, "https://one.example.org");
+  EXPECT_EQ(servers[0].posts, 1U);
+  EXPECT_EQ(servers[0].oldest, seconds(1));
+  EXPECT_GT(servers[0].untilNextTry, Duration(0));
+  EXPECT_EQ(outbox_->drop({.server = std::nullopt, .user = 1000}), 1U);
+  drain();
+  EXPECT_EQ(row(1000).droppedFor(Reason::outboxDropped), 2U);
+  outbox_->flush();
+  drain();
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"b"}));
+  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_TRUE(outbox_->list().empty());
+}
+
+TEST_F(OutboxTest, TellsTheOwnerOfEachTimeThatAPostMayHaveLeft) {
+  start();
+  postAndKeep();
+  EXPECT_TRUE(test_.departures.all().empty()) << "nobody listened";
+  pass(seconds(5));
+  fail(last(), 28);
+  ASSERT_EQ(test_.departures.all().size(), 1U);
+  EXPECT_FALSE(test_.departures.all()[0].isAnswered);
+  pass(seconds(10));
+  answer(last(), 200);
+  ASSERT_EQ(test_.departures.all().size(), 2U);
+  const Departure departure = test_.departures.all()[1];
+  EXPECT_TRUE(departure.isAnswered);
+  EXPECT_EQ(departure.program, (ReportingProgram{1000, 7, "videocall", "call"}));
+  EXPECT_EQ(departure.server, kServer);
+  EXPECT_EQ(departure.events, 2U);
+  EXPECT_EQ(departure.bytes, 4U);
+}
+
+TEST_F(OutboxTest, StopsSendingButGoesOnKeepingAtTheEnd) {
+  start();
+  postAndKeep("a");
+  pass(seconds(5));
+  ASSERT_EQ(openBodies().size(), 1U);
+  outbox_->stopSending();
+  drain();
+  EXPECT_TRUE(openBodies().empty());
+  postAndKeep("b");
+  pass(hours(1));
+  EXPECT_TRUE(openBodies().empty());
+  EXPECT_EQ(disk_->posts.size(), 2U);
+}
+
+// A week without the server, 100,000 posts, a restart each day.
+TEST_F(OutboxTest, DeliversAWeeksOutageInOrderAndOnce) {
+  constexpr int kPosts = 100000, kDays = 7;
+  waitLong();
+  start();
+  std::vector<std::string> taken;
+  bool isUp = false;
+  const auto respond = [&](const URLRequest& request) -> std::optional<FakeURLSessionFactory::Reply> {
+    FakeURLSessionFactory::Reply reply;
+    if (!isUp) {
+      reply.error = Error{kKYTURLErrorDomain, 7, "unreachable"};
+      return reply;
+    }
+    taken.emplace_back(request.body.view());
+    return reply;
+  };
+  int number = 0;
+  for (int day = 0; day < kDays; ++day) {
+    network_->setResponder(respond);
+    for (int hour = 0; hour < 24; ++hour) {
+      while (number < kPosts * (day * 24 + hour + 1) / (kDays * 24)) {
+        static_cast<void>(post(std::to_string(number), 1000, "", 1));
+        ++number;
+      }
+      pass(hours(1));
+    }
+    if (day + 1 < kDays) {
+      restart();
+      EXPECT_EQ(row().outbox, static_cast<uint64_t>(number));
+    }
+  }
+  ASSERT_EQ(disk_->posts.size(), static_cast<size_t>(kPosts));
+  isUp = true;
+  pass(hours(1));
+  ASSERT_EQ(taken.size(), static_cast<size_t>(kPosts));
+  for (int i = 0; i < kPosts; ++i) ASSERT_EQ(taken[static_cast<size_t>(i)], std::to_string(i));
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_EQ(row().delivered, static_cast<uint64_t>(kPosts));
+  EXPECT_EQ(row().outbox, 0U);
+}
+
+}  // namespace
+}  // namespace kyt
