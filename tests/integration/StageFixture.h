@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <utility>
@@ -57,6 +58,14 @@ class StageTest : public ::testing::Test {
   }
 
   [[nodiscard]] std::string socket() const { return stage_->socketPath(); }
+  // Whether each thread of this process has taken a SIGSTOP: kill() returns before.
+  static bool standsStill(int process) {
+    std::error_code none;
+    for (const auto& task :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(process) + "/task", none))
+      if (contents(task.path().string() + "/stat").find(") T ") == std::string::npos) return false;
+    return !none;
+  }
   [[nodiscard]] std::string daemonLog() const { return contents(stage_->daemonLog()); }
   [[nodiscard]] bool logged(std::string_view text) const {
     return daemonLog().find(text) != std::string::npos;

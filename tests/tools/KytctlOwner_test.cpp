@@ -64,14 +64,6 @@ class KytctlOwner : public StageTest {
   std::string state(const std::string& file) const {
     return stage_->folder() + "/var/lib/kytreportingd/defaults/" + file;
   }
-  // Each of its threads has taken the SIGSTOP.
-  static bool standsStill(int process) {
-    std::error_code none;
-    for (const auto& task :
-         std::filesystem::directory_iterator("/proc/" + std::to_string(process) + "/task", none))
-      if (!has(contents(task.path().string() + "/stat"), ") T ")) return false;
-    return !none;
-  }
   size_t messageLogs() const {
     std::error_code none;
     size_t files = 0;

@@ -282,6 +282,7 @@ TEST_F(Mistakes, ASessionThatIsClosedWithoutFinishIsToldByDebugLines) {
     TestClient client(socket(), 20, "person");
     EXPECT_EQ(client.configure(), "live: httppost");
     stage_->daemon()->signal(SIGSTOP);
+    ASSERT_TRUE(eventually([&] { return standsStill(stage_->daemon()->pid()); }));
     for (int i = 0; i < 10; ++i) EXPECT_TRUE(client.send(3, 4, {}));
     EXPECT_TRUE(eventually([&] { return client->statistics().sent == 10; })) << "written";
   }
