@@ -1,5 +1,6 @@
 #include "platform/base/Allocation.h"
 
+#include <atomic>
 #include <cstdlib>
 #include <new>
 
@@ -16,6 +17,8 @@ void* insist(Try tryOnce) {
   }
 }
 
+std::atomic<bool> wasRefused{false};
+
 }  // namespace
 
 void* allocate(size_t bytes) {
@@ -24,6 +27,14 @@ void* allocate(size_t bytes) {
 
 void* allocateZeros(size_t bytes) {
   return insist([bytes] { return std::calloc(1, bytes); });
+}
+
+bool memoryWasRefused() {
+  return wasRefused.load(std::memory_order_relaxed);
+}
+
+void setMemoryWasRefused(bool was) {
+  wasRefused.store(was, std::memory_order_relaxed);
 }
 
 }  // namespace kyt

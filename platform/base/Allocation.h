@@ -11,4 +11,8 @@ namespace kyt {
 [[nodiscard]] void* allocate(size_t bytes);
 [[nodiscard]] void* allocateZeros(size_t bytes);
 
+// Whether the system has refused this process memory, so that it ends soon: nothing more is taken in.
+[[nodiscard]] bool memoryWasRefused();
+void setMemoryWasRefused(bool was);
+
 }  // namespace kyt

@@ -1,6 +1,7 @@
 // The reading half of DBusConnection: one turn on the connection's queue.
 #include <utility>
 
+#include "platform/base/Allocation.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Limits.h"
 #include "platform/ipc/DBusConnection.h"
@@ -96,14 +97,15 @@ void DBusConnection::Progress::countCall(const Clock& clock) {
 
 // Looks at what was kept, when that may hold a message, or else reads once; handles what there is.
 DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress& progress) {
-  if (life_.reached(Life::stopping)) return Step::stopped;
+  const bool finishing = life_.reached(Life::finishing);
+  if (life_.reached(Life::stopping) || (finishing && memoryWasRefused())) return Step::stopped;
   if (mustPause()) return Step::paused;
   std::span<const std::byte> bytes;
   Step after = Step::more;
   if (kept_.mayHoldMessage()) {
     bytes = kept_.bytes();
   } else {
-    if (life_.reached(Life::finishing)) return Step::stopped;
+    if (finishing) return Step::stopped;
     const size_t before = kept_.copyTo(buffer);
     size_t read = 0;
     after = readMore(buffer.subspan(before), read);
@@ -131,7 +133,7 @@ DBusConnection::Step DBusConnection::step(std::span<std::byte> buffer, Progress&
 }
 
 bool DBusConnection::mustPause() const {
-  return !hurried_ && !life_.reached(Life::finishing) && output_->paused();
+  return !hurried_ && !life_.reached(Life::finishing) && (output_->paused() || memoryWasRefused());
 }
 
 // One read. A read that did not fill the buffer has emptied the socket, unless descriptors came with it,

@@ -1,6 +1,7 @@
 // What happens when the system refuses memory: the daemon ends, as orderly as it can. Some address space is kept back for
 // that; the first refusal gives it up, says so on standard error, and asks for the end, and then what was asked for is
-// tried again. When even that is used up the process ends at once, with a line and status 1.
+// tried again. Each thread tries again once; when even that is used up the process ends at once, with a line and status
+// 1.
 //
 // It concerns what C++ code allocates, with operator new or as objects do (platform/base/Allocation.h). Libraries in C get
 // a null pointer, and report an error.
@@ -26,7 +27,7 @@ class MemoryReserve {
   [[nodiscard]] bool isUsed() const { return used_.load(); }
 
  private:
-  static void memoryWasRefused();
+  static void refused();
   void use();
 
   StopSignals& stopSignals_;
