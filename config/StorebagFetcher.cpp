@@ -20,8 +20,6 @@ namespace kyt {
 
 namespace {
 
-constexpr Duration kRequestTimeout = std::chrono::seconds(15);
-constexpr int kMaxRedirects = 5;
 constexpr char kFallbackStorebagName[] = "cadmor";
 
 // What sessions of the family "cadmor" get while their server cannot be reached. Built in, so never verified.
@@ -34,22 +32,6 @@ Dictionary fallbackStorebag() {
                     {"release", section},
                     {"version", "1.0.0-Cadmor-Fallback"},
                     {"refresh_cycle", kFallbackRefreshCycle}};
-}
-
-// The number after "max-age" in a "Cache-Control" header. Only pieces between "=" and blanks are looked at,
-// so a comma that touches the word hides it, deliberately: servers' answers have been tuned to this reading.
-int32_t maxAgeFromCacheControl(std::optional<std::string_view> header) {
-  if (!header) return kMaxStorebagAge;
-  bool found = false;
-  size_t begin = 0;
-  while (begin <= header->size()) {
-    const size_t end = std::min(header->find_first_of("= ", begin), header->size());
-    const std::string_view piece = header->substr(begin, end - begin);
-    if (found) return Value(piece).intValue();
-    found = piece == "max-age";
-    begin = end + 1;
-  }
-  return kMaxStorebagAge;
 }
 
 const Dictionary* sectionEntry(const Dictionary& bag, const std::optional<String>& name) {
@@ -82,10 +64,32 @@ std::optional<Dictionary> signedContents(const Data& bag, PropertyLists& propert
   return *dictionary;
 }
 
+std::string toldRefusal(const std::string& why, Log& log) {
+  log.normal("fetchStorebagWithName: The storebag is refused: %s", why.c_str());
+  return "the storebag is refused: " + why;
+}
+
 }  // namespace
 
-StorebagFetcher::StorebagFetcher(Configuration configuration, Mutex& backendClassLock)
-    : configuration_(configuration), backendClassLock_(backendClassLock) {}
+int32_t maxAgeFromCacheControl(std::optional<std::string_view> header) {
+  if (!header) return kMaxStorebagAge;
+  bool found = false;
+  size_t begin = 0;
+  while (begin <= header->size()) {
+    const size_t end = std::min(header->find_first_of("= ", begin), header->size());
+    const std::string_view piece = header->substr(begin, end - begin);
+    if (found) return Value(piece).intValue();
+    found = piece == "max-age";
+    begin = end + 1;
+  }
+  return kMaxStorebagAge;
+}
+
+StorebagFetcher::StorebagFetcher(Configuration configuration, Mutex& backendClassLock,
+                                 StorebagRefusals refusals)
+    : configuration_(configuration),
+      backendClassLock_(backendClassLock),
+      guard_(configuration.platform, refusals) {}
 
 URLRequest StorebagFetcher::storebagRequest(const std::optional<String>& name,
                                             const std::optional<String>& lastModified) const {
@@ -94,8 +98,8 @@ URLRequest StorebagFetcher::storebagRequest(const std::optional<String>& name,
   URLRequest request;
   request.url = formatObjects("%@/%@?version=%@", {configuration_.environment.storebagServerURL(),
                                                    name ? Value(*name) : Value(), version});
-  request.timeout = kRequestTimeout;
-  request.maxRedirects = kMaxRedirects;
+  request.timeout = kStorebagRequestTimeout;
+  request.maxRedirects = kMaxStorebagRedirects;
   log.debug("fetchStorebagWithName: Storebag Server URL: %s", request.url.c_str());
   if (lastModified) {
     log.debug("fetchStorebagWithName: Adding 'Last-Modified: %s' to the header", lastModified->c_str());
@@ -133,7 +137,10 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
   if (const std::optional<std::string> modified = reply.response->header("Last-Modified")) {
     if (lastModified && (!reply.data || reply.data->empty())) {
       log.debug("fetchStorebagWithName: storebag content has not changed. using its cached version");
-      fetch.result = NotModified();
+      if (const auto why = name ? guard_.refusalOfTheLast(*name) : std::nullopt)
+        fetch.problem = toldRefusal(*why, log);
+      else
+        fetch.result = NotModified();
       return fetch;
     }
     fetch.lastModified = String(*modified);
@@ -142,7 +149,12 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
   // The status decides nothing, but an error page is no storebag, and then it is the reason that helps.
   const int status = reply.response->status;
   if (std::optional<Dictionary> bag = verifiedBag(reply, fetch.problem)) {
-    fetch.result = std::move(*bag);
+    if (const std::optional<std::string> why = refusal(name, reply, *bag)) {
+      fetch.problem = toldRefusal(*why, log);
+      fetch.lastModified = lastModified;
+    } else {
+      fetch.result = std::move(*bag);
+    }
   } else if (status < 200 || status > 299) {
     log.normal("fetchStorebagWithName: %s answered with status %d", address.c_str(), status);
     fetch.problem = "status " + std::to_string(status);
@@ -181,6 +193,27 @@ bool StorebagFetcher::verifies(const Data& bag, const Data& signature) const {
   return false;
 }
 
+bool StorebagFetcher::verifiesSHA256(const URLReply& reply) const {
+  Cryptography& cryptography = configuration_.platform.cryptography;
+  const auto document = configuration_.platform.propertyLists.parse(reply.data->view());
+  const Value* root = std::get_if<Value>(&document);
+  const Dictionary* dictionary = root != nullptr ? root->dictionary() : nullptr;
+  const String* text = dictionary != nullptr ? dictionary->string(kStorebagSignature256) : nullptr;
+  const std::optional<Data> signature = text != nullptr ? base64Decode(*text) : std::nullopt;
+  if (!signature) return false;
+  const auto digest = cryptography.sha256(base64Decode(*dictionary->string("bag"))->bytes());
+  for (const auto& key : publicKeys())
+    if (key->verifySHA256(digest, signature->bytes())) return true;
+  return false;
+}
+
+std::optional<std::string> StorebagFetcher::refusal(const std::optional<String>& name, const URLReply& reply,
+                                                    const Dictionary& bag) {
+  if (guard_.requiresSHA256() && !verifiesSHA256(reply))
+    return std::string("it has no \"") + kStorebagSignature256 + "\" that verifies";
+  return name ? guard_.refusal(*name, bag) : std::nullopt;
+}
+
 std::optional<Dictionary> StorebagFetcher::verifiedBag(const URLReply& reply, std::string& problem) {
   Log& log = configuration_.platform.log;
   PropertyLists& propertyLists = configuration_.platform.propertyLists;
@@ -217,7 +250,8 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
               clientType);
     return fetch;
   }
-  Fetch<Dictionary> whole = fetchStorebagWithName(storebagNameForClientType(clientType), lastModified);
+  const std::optional<String> name = storebagNameForClientType(clientType);
+  Fetch<Dictionary> whole = fetchStorebagWithName(name, lastModified);
   fetch.maxAge = whole.maxAge;
   fetch.lastModified = std::move(whole.lastModified);
   fetch.address = std::move(whole.address);
@@ -251,6 +285,8 @@ StorebagFetcher::Fetch<StorebagFetcher::Section> StorebagFetcher::fetchStorebagF
     fetch.maxAge = std::min(refreshCycle->intValue(), kMaxStorebagAge);
     log.normal("fetchStorebagForEnvironmentAndClientType: Store bag override MaxAge=%d", fetch.maxAge);
   }
+  // The built-in one, which comes with a problem, is none that a server could play back.
+  if (name && fetch.problem.empty()) guard_.taken(*name, *bag);
   fetch.result = Section{*section, *version};
   return fetch;
 }

@@ -6,6 +6,8 @@
 // A fetch blocks its thread until the reply is there, at most 15 seconds, or until the shut-down cancels what
 // threads wait for; then none can begin any more. The requests of the whole process go through one URL session,
 // made at first use while holding the lock of the class KYTReportingBackend, which the composition root owns.
+// What the administrator wants refused although it verifies (config/StorebagGuard.h) is a failed fetch too, but the
+// server is asked again with the date of the last good bag, not of the refused one.
 // Every failure is a `Failed` and log lines that tell its cause at the default level; nothing here is fatal.
 //
 // The keys are read at each download: "publicKey.der" of the client framework's bundle and, where it is there,
@@ -16,10 +18,12 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <variant>
 #include <vector>
 
 #include "config/Configuration.h"
+#include "config/StorebagGuard.h"
 #include "platform/Cryptography.h"
 #include "platform/URLSession.h"
 #include "platform/base/Mutex.h"
@@ -29,6 +33,14 @@ namespace kyt {
 
 // No reply, however it asks, is kept longer than a day.
 inline constexpr int32_t kMaxStorebagAge = 86400;  // seconds
+
+// How each request is made: seconds from start to end, and how often it may be sent elsewhere.
+inline constexpr Duration kStorebagRequestTimeout = std::chrono::seconds(15);
+inline constexpr int kMaxStorebagRedirects = 5;
+
+// The number after "max-age" in a "Cache-Control" header, a day without one. Only pieces between "=" and blanks are looked
+// at, so a comma that touches the word hides it, deliberately: servers' answers have been tuned to this reading.
+[[nodiscard]] int32_t maxAgeFromCacheControl(std::optional<std::string_view> header);
 
 class StorebagFetcher {
  public:
@@ -51,7 +63,7 @@ class StorebagFetcher {
     std::string problem;                 // why there is no good bag of the server's; empty: there is
   };
 
-  StorebagFetcher(Configuration configuration, Mutex& backendClassLock);
+  StorebagFetcher(Configuration configuration, Mutex& backendClassLock, StorebagRefusals refusals = {});
   StorebagFetcher(const StorebagFetcher&) = delete;
   StorebagFetcher& operator=(const StorebagFetcher&) = delete;
 
@@ -70,12 +82,17 @@ class StorebagFetcher {
   URLSession& urlSession();
   // None with the reason in `problem`.
   std::optional<Dictionary> verifiedBag(const URLReply& reply, std::string& problem);
+  // Why a bag that verifies is refused all the same; none: it is not.
+  [[nodiscard]] std::optional<std::string> refusal(const std::optional<String>& name, const URLReply& reply,
+                                                   const Dictionary& bag);
   [[nodiscard]] const Dictionary* sectionInForce(const Dictionary& bag, int32_t clientType) const;
   [[nodiscard]] std::vector<std::unique_ptr<PublicKey>> publicKeys() const;
   [[nodiscard]] bool verifies(const Data& bag, const Data& signature) const;
+  [[nodiscard]] bool verifiesSHA256(const URLReply& reply) const;
 
   Configuration configuration_;
   Mutex& backendClassLock_;
+  StorebagGuard guard_;
   std::unique_ptr<URLSession> urlSession_ GUARDED_BY(backendClassLock_);
 };
 

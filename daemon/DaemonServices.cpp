@@ -70,7 +70,7 @@ DaemonServices::DaemonServices(Start start)
       backendFactory_(configuration_, backendTable(configuration_)),
       messageLog_(start.messageLogs, system_.files, system_.clock, log_, counters_,
                   system_.budget.most(Share::messageLogBytes)),
-      fetcher_(configuration_, backendClassLock_),
+      fetcher_(configuration_, backendClassLock_, settings_.storebagRefusals),
       sessionClass_(configuration_, backendFactory_, messageLog_),
       queue_(SerialQueue::create("com.vantu.kytreportingd", system_.workers)),
       lineLimits_(log_, system_.clock, *system_.reactor, queue_, system_.budget.most(Share::logLines)),

@@ -16,6 +16,8 @@ class PublicKey {
   virtual ~PublicKey() = default;
   // RSA PKCS#1 v1.5 over a SHA-1 digest.
   [[nodiscard]] virtual bool verifySHA1(const std::array<std::byte, 20>& digest, Bytes signature) const = 0;
+  // The same over a SHA-256 digest.
+  [[nodiscard]] virtual bool verifySHA256(const std::array<std::byte, 32>& digest, Bytes signature) const = 0;
 };
 
 class Cryptography {

@@ -17,6 +17,7 @@ namespace kyt {
 inline constexpr char kKYTReportingDefaultsDomain[] = "com.vantu.kytreporting";
 inline constexpr char kDiagnosticsDefaultsDomain[] = "com.vantu.diagnostics";
 inline constexpr char kTimedDefaultsDomain[] = "com.vantu.timed";
+inline constexpr char kStorebagDefaultsDomain[] = "com.vantu.kytreporting.storebags";  // name to serial
 
 class UserDefaults {
  public:

@@ -30,11 +30,20 @@ struct OutboxSettings {
   friend bool operator==(const OutboxSettings&, const OutboxSettings&) = default;
 };
 
+// Which storebags with a good signature are refused all the same. Off, nothing of this is looked at.
+struct StorebagRefusals {
+  bool older = false;          // a lower "serial" than one taken before, or none after one
+  bool expired = false;        // its "expires" has passed
+  bool withoutSHA256 = false;  // no "signature256" that verifies
+  friend bool operator==(const StorebagRefusals&, const StorebagRefusals&) = default;
+};
+
 struct Settings {
   // Storebag hosts as addresses without a trailing slash ("https://bags.example.org"); the paths are
   // appended.
   std::string storebagInternalHost;
   std::string storebagPublicHost;
+  StorebagRefusals storebagRefusals;
   std::string caFile;                           // PEM; empty: the system's
   std::vector<std::string> cellularInterfaces;  // glob patterns of interface names
   Limits limits;

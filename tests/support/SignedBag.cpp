@@ -42,11 +42,11 @@ Data publicKeyOf(EVP_PKEY* key) {
   return data;
 }
 
-std::string sign(std::string_view bytes) {
+std::string sign(std::string_view bytes, const EVP_MD* digest) {
   const std::unique_ptr<EVP_MD_CTX, FreeContext> context(EVP_MD_CTX_new());
   size_t length = 0;
   const auto* data = reinterpret_cast<const unsigned char*>(bytes.data());
-  if (EVP_DigestSignInit(context.get(), nullptr, EVP_sha1(), nullptr, signingKey()) != 1 ||
+  if (EVP_DigestSignInit(context.get(), nullptr, digest, nullptr, signingKey()) != 1 ||
       EVP_DigestSign(context.get(), nullptr, &length, data, bytes.size()) != 1)
     std::abort();
   std::string signature(length, '\0');
@@ -69,13 +69,21 @@ Data otherPublicKey() {
 }
 
 std::string signedDocument(std::string_view bagBytes, PropertyLists& propertyLists) {
-  const std::string signature = sign(bagBytes);
+  const std::string signature = sign(bagBytes, EVP_sha1());
   return propertyLists.serialize(Dictionary{{"signature", base64(std::as_bytes(std::span(signature)))},
                                             {"bag", base64(std::as_bytes(std::span(bagBytes)))}});
 }
 
 std::string signedBag(const Dictionary& bag, PropertyLists& propertyLists) {
   return signedDocument(propertyLists.serialize(bag), propertyLists);
+}
+
+std::string doublySignedBag(const Dictionary& bag, PropertyLists& propertyLists) {
+  const std::string bytes = propertyLists.serialize(bag);
+  const std::string first = sign(bytes, EVP_sha1()), second = sign(bytes, EVP_sha256());
+  return propertyLists.serialize(Dictionary{{"signature", base64(std::as_bytes(std::span(first)))},
+                                            {"signature256", base64(std::as_bytes(std::span(second)))},
+                                            {"bag", base64(std::as_bytes(std::span(bytes)))}});
 }
 
 Dictionary releaseBag(const Dictionary& section, const char* version) {

@@ -16,6 +16,8 @@ namespace kyt {
 // {"signature": …, "bag": …} around these bytes, whatever they are.
 [[nodiscard]] std::string signedDocument(std::string_view bagBytes, PropertyLists& propertyLists);
 [[nodiscard]] std::string signedBag(const Dictionary& bag, PropertyLists& propertyLists);
+// The same with a second signature, over SHA-256.
+[[nodiscard]] std::string doublySignedBag(const Dictionary& bag, PropertyLists& propertyLists);
 
 // A bag with one section for the environment "release".
 [[nodiscard]] Dictionary releaseBag(const Dictionary& section, const char* version = "1.0");

@@ -132,7 +132,7 @@ struct Rehearsal::Parts {
         environment(platform, deviceIdentity, device.hosts),
         configuration{platform, deviceIdentity, environment},
         factory(configuration, watchedTable()),
-        fetcher(configuration, backendClassLock),
+        fetcher(configuration, backendClassLock, device.refusals),
         sessionClass(configuration, factory, messageLog),
         agent(configuration, fetcher, sessionClass, transaction) {
     clock.setTimeOfDay(device.now);

@@ -17,6 +17,7 @@
 #include "platform/base/Clock.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
+#include "platform/base/Settings.h"
 #include "platform/fake/FakeURLSession.h"
 #include "platform/objects/Value.h"
 
@@ -48,6 +49,7 @@ struct RehearsedDevice {
   Bundle& daemonBundle;
   StorebagHosts hosts;
   Limits limits;
+  StorebagRefusals refusals;
   TimeValue now;
 };
 

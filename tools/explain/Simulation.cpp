@@ -306,6 +306,7 @@ Dictionary simulate(const RehearsedDevice& device, const Rehearsal::StorebagServ
                               .daemonBundle = device.daemonBundle,
                               .hosts = device.hosts,
                               .limits = device.limits,
+                              .refusals = {},
                               .now = kNow};
     for (const SimulatedSession& session : sessions) {
       Rehearsal rehearsal(one, server, session.program, chance.below(kDraws));

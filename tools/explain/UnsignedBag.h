@@ -17,7 +17,7 @@ namespace kyt::tools {
 [[nodiscard]] inline std::string unsignedDocument(const Dictionary& bag, PropertyLists& propertyLists) {
   const std::string bytes = propertyLists.serialize(bag);
   return propertyLists.serialize(
-      Dictionary{{"signature", ""}, {"bag", base64(std::as_bytes(std::span(bytes)))}});
+      Dictionary{{"signature", ""}, {"signature256", ""}, {"bag", base64(std::as_bytes(std::span(bytes)))}});
 }
 
 class AnySignature final : public Cryptography {
@@ -36,6 +36,7 @@ class AnySignature final : public Cryptography {
   class AnyKey final : public PublicKey {
    public:
     [[nodiscard]] bool verifySHA1(const std::array<std::byte, 20>&, Bytes) const override { return true; }
+    [[nodiscard]] bool verifySHA256(const std::array<std::byte, 32>&, Bytes) const override { return true; }
   };
   Cryptography& real_;
 };

@@ -43,7 +43,8 @@ DevicePorts::DevicePorts(const std::string& root, bool withStorebagServer)
   } else {
     settings_ = std::get<Settings>(std::move(read));
   }
-  for (const char* domain : {kKYTReportingDefaultsDomain, kDiagnosticsDefaultsDomain, kTimedDefaultsDomain}) {
+  for (const char* domain : {kKYTReportingDefaultsDomain, kDiagnosticsDefaultsDomain, kTimedDefaultsDomain,
+                             kStorebagDefaultsDomain}) {
     noteUnreadable(paths_.userDefaults() + "/" + domain + ".toml");
     static_cast<void>(userDefaults_.values(domain));  // a broken file is told in the log
   }
@@ -77,10 +78,12 @@ RehearsedDevice DevicePorts::device(bool verified) {
       .daemonBundle = daemonBundle_,
       .hosts = {},
       .limits = {},
+      .refusals = {},
       .now = clock_.timeOfDay()};
   if (settings_) {
     device.hosts = {settings_->storebagInternalHost, settings_->storebagPublicHost};
     device.limits = settings_->limits;
+    if (verified) device.refusals = settings_->storebagRefusals;  // a draft has no serial yet
   }
   return device;
 }

@@ -79,6 +79,7 @@ template CommandOption Command::option(const char*, std::optional<uint16_t>&, co
 template CommandOption Command::option(const char*, int32_t&, const char*) const;
 template CommandOption Command::option(const char*, std::optional<int32_t>&, const char*) const;
 template CommandOption Command::option(const char*, uint32_t&, const char*) const;
+template CommandOption Command::option(const char*, std::optional<uint32_t>&, const char*) const;
 template CommandOption Command::option(const char*, uint64_t&, const char*) const;
 template CommandOption Command::option(const char*, double&, const char*) const;
 

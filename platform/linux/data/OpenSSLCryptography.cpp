@@ -44,20 +44,30 @@ std::array<std::byte, Size> digest(const EVP_MD* algorithm, Bytes bytes) {
 
 class RSAPublicKey : public PublicKey {
  public:
-  RSAPublicKey(Key key, const EVP_MD* sha1) : key_(std::move(key)), sha1_(sha1) {}
+  RSAPublicKey(Key key, const EVP_MD* sha1, const EVP_MD* sha256)
+      : key_(std::move(key)), sha1_(sha1), sha256_(sha256) {}
 
   [[nodiscard]] bool verifySHA1(const std::array<std::byte, 20>& hash, Bytes signature) const override {
-    const KeyContext context(EVP_PKEY_CTX_new_from_pkey(nullptr, key_.get(), nullptr));
-    return context != nullptr && EVP_PKEY_verify_init(context.get()) == 1 &&
-           EVP_PKEY_CTX_set_rsa_padding(context.get(), RSA_PKCS1_PADDING) == 1 &&
-           EVP_PKEY_CTX_set_signature_md(context.get(), sha1_) == 1 &&
-           EVP_PKEY_verify(context.get(), octets(signature), signature.size(),
-                           reinterpret_cast<const unsigned char*>(hash.data()), hash.size()) == 1;
+    return verifies(sha1_, hash, signature);
+  }
+  [[nodiscard]] bool verifySHA256(const std::array<std::byte, 32>& hash, Bytes signature) const override {
+    return verifies(sha256_, hash, signature);
   }
 
  private:
+  [[nodiscard]] bool verifies(const EVP_MD* algorithm, Bytes hash, Bytes signature) const {
+    const KeyContext context(EVP_PKEY_CTX_new_from_pkey(nullptr, key_.get(), nullptr));
+    return context != nullptr && EVP_PKEY_verify_init(context.get()) == 1 &&
+           EVP_PKEY_CTX_set_rsa_padding(context.get(), RSA_PKCS1_PADDING) == 1 &&
+           EVP_PKEY_CTX_set_signature_md(context.get(), algorithm) == 1 &&
+           EVP_PKEY_verify(context.get(), octets(signature), signature.size(), octets(hash), hash.size()) ==
+               1;
+  }
+
   Key key_;
-  const EVP_MD* sha1_;  // of the Cryptography object, which outlives its keys
+  // Of the Cryptography object, which outlives its keys.
+  const EVP_MD* sha1_;
+  const EVP_MD* sha256_;
 };
 
 }  // namespace
@@ -112,7 +122,7 @@ std::unique_ptr<PublicKey> OpenSSLCryptography::publicKeyFromDER(Bytes der) {
   // Bytes that follow the key would be ignored by a lenient reader; a key file has none.
   if (key == nullptr || next != octets(der) + der.size() || EVP_PKEY_get_base_id(key.get()) != EVP_PKEY_RSA)
     return nullptr;
-  return std::make_unique<RSAPublicKey>(std::move(key), algorithms_->sha1.get());
+  return std::make_unique<RSAPublicKey>(std::move(key), algorithms_->sha1.get(), algorithms_->sha256.get());
 }
 
 }  // namespace kyt

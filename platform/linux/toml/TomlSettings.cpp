@@ -143,10 +143,26 @@ const char* setAdminGroup(const TomlNode& node, Settings& settings) {
   return nullptr;
 }
 
-const char* setOutboxEnabled(const TomlNode& node, Settings& settings) {
-  const auto* enabled = std::get_if<bool>(&node.value);
-  if (enabled == nullptr) return "must be true or false";
-  settings.outbox.enabled = *enabled;
+// The member that a setting is, wherever in the settings it stands.
+template <auto field, typename Whole>
+auto& memberOf(Whole& settings) {
+  if constexpr (requires { settings.limits.*field; })
+    return settings.limits.*field;
+  else if constexpr (requires { settings.compression.*field; })
+    return settings.compression.*field;
+  else if constexpr (requires { settings.outbox.*field; })
+    return settings.outbox.*field;
+  else if constexpr (requires { settings.storebagRefusals.*field; })
+    return settings.storebagRefusals.*field;
+  else
+    return settings.*field;
+}
+
+template <auto field>
+const char* setSwitch(const TomlNode& node, Settings& settings) {
+  const auto* on = std::get_if<bool>(&node.value);
+  if (on == nullptr) return "must be true or false";
+  memberOf<field>(settings) = *on;
   return nullptr;
 }
 
@@ -160,19 +176,6 @@ const char* setOutboxNumber(const TomlNode& node, Settings& settings) {
   }
   settings.outbox.*field = static_cast<uint64_t>(*number);
   return nullptr;
-}
-
-// The member that a setting is, wherever in the settings it stands.
-template <auto field, typename Whole>
-auto& memberOf(Whole& settings) {
-  if constexpr (requires { settings.limits.*field; })
-    return settings.limits.*field;
-  else if constexpr (requires { settings.compression.*field; })
-    return settings.compression.*field;
-  else if constexpr (requires { settings.outbox.*field; })
-    return settings.outbox.*field;
-  else
-    return settings.*field;
 }
 
 struct Setting {
@@ -205,6 +208,12 @@ constexpr Setting kSettings[] = {
                                              setHost<&Settings::storebagInternalHost>, Taking::atStart),
     setting<&Settings::storebagPublicHost>("storebag", "public_host", setHost<&Settings::storebagPublicHost>,
                                            Taking::atStart),
+    setting<&StorebagRefusals::older>("storebag", "refuse_older", setSwitch<&StorebagRefusals::older>,
+                                      Taking::atStart),
+    setting<&StorebagRefusals::expired>("storebag", "refuse_expired", setSwitch<&StorebagRefusals::expired>,
+                                        Taking::atStart),
+    setting<&StorebagRefusals::withoutSHA256>("storebag", "require_sha256",
+                                              setSwitch<&StorebagRefusals::withoutSHA256>, Taking::atStart),
     setting<&Settings::caFile>("tls", "ca_file", setCAFile, Taking::whileRunning),
     setting<&Settings::cellularInterfaces>("network", "cellular_interfaces", setCellularInterfaces,
                                            Taking::whileRunning),
@@ -246,7 +255,8 @@ constexpr Setting kSettings[] = {
     setting<&CompressionSettings::library>("compression", "library", setCompressionLibrary, Taking::atStart),
     setting<&CompressionSettings::level>("compression", "level", setCompressionLevel, Taking::atStart),
     setting<&Settings::adminGroup>("admin", "group", setAdminGroup, Taking::atStart),
-    setting<&OutboxSettings::enabled>("outbox", "enabled", setOutboxEnabled, Taking::atStart),
+    setting<&OutboxSettings::enabled>("outbox", "enabled", setSwitch<&OutboxSettings::enabled>,
+                                      Taking::atStart),
     setting<&OutboxSettings::maxBytes>(
         "outbox", "max_bytes", setOutboxNumber<&OutboxSettings::maxBytes, kLeastOutbox, kLargestOutbox>,
         Taking::atStart),

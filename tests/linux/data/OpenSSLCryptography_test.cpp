@@ -38,11 +38,11 @@ std::vector<std::byte> derOf(EVP_PKEY* key) {
   return bytes;
 }
 
-std::vector<std::byte> signature(EVP_PKEY* key, Bytes bytes) {
+std::vector<std::byte> signature(EVP_PKEY* key, Bytes bytes, const EVP_MD* digest = EVP_sha1()) {
   EVP_MD_CTX* context = EVP_MD_CTX_new();
   size_t size = 0;
   const auto* data = reinterpret_cast<const unsigned char*>(bytes.data());
-  EXPECT_EQ(EVP_DigestSignInit(context, nullptr, EVP_sha1(), nullptr, key), 1);
+  EXPECT_EQ(EVP_DigestSignInit(context, nullptr, digest, nullptr, key), 1);
   EXPECT_EQ(EVP_DigestSign(context, nullptr, &size, data, bytes.size()), 1);
   std::vector<std::byte> result(size);
   EXPECT_EQ(
@@ -87,6 +87,19 @@ TEST(PublicKey, VerifiesWhatItsPrivateKeySigned) {
   EXPECT_FALSE(publicKey->verifySHA1(cryptography.sha1(text), signedText));
   const Key other(EVP_RSA_gen(2048));
   EXPECT_FALSE(publicKey->verifySHA1(cryptography.sha1(text), signature(other.get(), text)));
+}
+
+TEST(PublicKey, TellsSignaturesOverTheTwoDigestsApart) {
+  const Key key(EVP_RSA_gen(2048));
+  OpenSSLCryptography cryptography;
+  const auto publicKey = cryptography.publicKeyFromDER(derOf(key.get()));
+  ASSERT_NE(publicKey, nullptr);
+  const Bytes text = bytesOf("a storebag");
+  const auto over1 = signature(key.get(), text), over256 = signature(key.get(), text, EVP_sha256());
+  EXPECT_TRUE(publicKey->verifySHA256(cryptography.sha256(text), over256));
+  EXPECT_FALSE(publicKey->verifySHA256(cryptography.sha256(text), over1));
+  EXPECT_FALSE(publicKey->verifySHA1(cryptography.sha1(text), over256));
+  EXPECT_FALSE(publicKey->verifySHA256(cryptography.sha256(bytesOf("another")), over256));
 }
 
 TEST(PublicKey, IsRefusedWhenItIsNoRSAKeyInDER) {
