@@ -48,11 +48,11 @@ KeyPointer privateKey(std::string_view pem) {
   return key;
 }
 
-std::optional<std::string> signature(EVP_PKEY* key, std::string_view bytes) {
+std::optional<std::string> signature(EVP_PKEY* key, const EVP_MD* digest, std::string_view bytes) {
   DigestPointer context(EVP_MD_CTX_new());
   size_t length = 0;
   const auto* data = reinterpret_cast<const unsigned char*>(bytes.data());
-  if (EVP_DigestSignInit(context.get(), nullptr, EVP_sha1(), nullptr, key) != 1 ||
+  if (EVP_DigestSignInit(context.get(), nullptr, digest, nullptr, key) != 1 ||
       EVP_DigestSign(context.get(), nullptr, &length, data, bytes.size()) != 1)
     return std::nullopt;
   std::string out(length, '\0');
@@ -163,10 +163,12 @@ std::variant<std::string, Error> StorebagFile::sign(const Dictionary& bag,
   const KeyPointer key = privateKey(privateKeyPEM);
   if (!key) return failure("this is no RSA private key in PEM form");
   const std::string bytes = propertyLists_.serialize(bag);
-  const std::optional<std::string> signed_ = signature(key.get(), bytes);
-  if (!signed_) return failure("the bag could not be signed");
+  const std::optional<std::string> signed_ = signature(key.get(), EVP_sha1(), bytes);
+  const std::optional<std::string> signed256 = signature(key.get(), EVP_sha256(), bytes);
+  if (!signed_ || !signed256) return failure("the bag could not be signed");
   Dictionary document;
   document.set("signature", base64(std::as_bytes(std::span(*signed_))));
+  document.set("signature256", base64(std::as_bytes(std::span(*signed256))));
   document.set("bag", base64(std::as_bytes(std::span(bytes))));
   return propertyLists_.serialize(document);
 }
@@ -188,8 +190,25 @@ std::variant<Dictionary, Error> StorebagFile::open(std::string_view document,
     if (!key) return failure("the public key is no RSA SubjectPublicKeyInfo in DER form");
     if (!key->verifySHA1(cryptography_.sha1(bag->bytes()), signed_->bytes()))
       return failure("the signature does not match the bag and this key");
+    const std::optional<Data> signed256 = decoded("signature256");
+    if (root->contains("signature256") &&
+        (!signed256 || !key->verifySHA256(cryptography_.sha256(bag->bytes()), signed256->bytes())))
+      return failure("the signature over SHA-256 does not match the bag and this key");
   }
   return read(bag->view(), "plist");
+}
+
+std::variant<Dictionary, Error> StorebagFile::openOrRead(const std::string& path) const {
+  auto text = readFile(path);
+  if (auto* error = std::get_if<Error>(&text)) return std::move(*error);
+  const std::string& bytes = std::get<std::string>(text);
+  auto bag = open(bytes, std::nullopt);
+  const size_t dot = path.rfind('.');
+  if (std::holds_alternative<Error>(bag))
+    bag = read(bytes, dot == std::string::npos ? "" : path.substr(dot + 1));
+  if (auto* error = std::get_if<Error>(&bag))
+    error->localizedDescription = path + ": " + error->localizedDescription;
+  return bag;
 }
 
 std::vector<std::string> StorebagFile::warnings(const Dictionary& bag) {

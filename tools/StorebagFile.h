@@ -36,13 +36,16 @@ class StorebagFile {
 
   // The bag in `text`; `format` is "json", "toml" or "plist" (a file's extension).
   [[nodiscard]] std::variant<Dictionary, Error> read(std::string_view text, std::string_view format) const;
-  // The document {"signature", "bag"} as a server hands it out. Fails when the key is no RSA private key, and
+  // The document {"signature", "signature256", "bag"} as a server hands it out. Fails when the key is no RSA private key, and
   // for a bag that every daemon would refuse (no "version" text).
   [[nodiscard]] std::variant<std::string, Error> sign(const Dictionary& bag,
                                                       std::string_view privateKeyPEM) const;
   // The bag inside a document; with a public key (DER) only if its signature holds.
   [[nodiscard]] std::variant<Dictionary, Error> open(std::string_view document,
                                                      std::optional<std::string_view> publicKeyDER) const;
+  // A document, its signature not checked, or a bag that nobody has signed yet; `path` is named in errors and tells
+  // the format.
+  [[nodiscard]] std::variant<Dictionary, Error> openOrRead(const std::string& path) const;
   // Sentences about what may surprise: one each, naming where.
   [[nodiscard]] static std::vector<std::string> warnings(const Dictionary& bag);
 

@@ -29,9 +29,27 @@ struct SendOptions {
 };
 
 struct SignOptions {
-  std::string bag;     // .json, .toml or .plist
-  std::string key;     // private key, PEM
-  std::string output;  // "-": standard output
+  std::string bag;                        // .json, .toml or .plist
+  std::string key;                        // private key, PEM
+  std::string output;                     // "-": standard output
+  std::optional<uint32_t> serial;         // instead of the bag's own
+  std::optional<uint32_t> expiresInDays;  // likewise
+};
+
+struct PublishOptions {
+  SignOptions sign;    // without an output
+  std::string folder;  // that a server hands out
+  std::string name;    // of the storebag; empty: the bag's file's
+};
+
+struct ProbeOptions {
+  std::string url;                // of the storebag, without "?version="
+  std::string publicKey, caFile;  // empty: the device's
+};
+
+struct RingOptions {
+  std::string identifier;  // of a device; empty: this one's
+  std::string address;     // with "{ring}" in it; empty: only tells the ring
 };
 
 struct CheckOptions {
@@ -102,6 +120,15 @@ struct SimulateOptions {
 [[nodiscard]] int verifyCommand(const std::string& document, const std::string& publicKey);
 // With a public key the signature is checked first.
 [[nodiscard]] int showCommand(const std::string& document, const std::string& publicKey);
+
+// Signs a bag and puts it where a server hands it out.
+[[nodiscard]] int publishCommand(const PublishOptions& options);
+// Tells what changes when one bag, signed or not, takes the place of another.
+[[nodiscard]] int diffCommand(const std::string& before, const std::string& after);
+// Asks a server for a storebag as the daemon does and tells what it gets wrong; 1: devices do not get it.
+[[nodiscard]] int probeCommand(const std::string& root, const ProbeOptions& options);
+// Tells in which of a hundred rings a device is, and lets it ask its ring's address from now on.
+[[nodiscard]] int ringCommand(const std::string& root, const RingOptions& options);
 
 // Tells how many sessions and events of many devices leave by that bag.
 [[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);

@@ -66,16 +66,9 @@ void print(const Dictionary& report, double bytesADay) {
 
 // The section that devices out in the world get.
 std::variant<Dictionary, Error> releaseSection(const std::string& path, DevicePorts& ports) {
-  auto text = readFile(path);
-  if (auto* error = std::get_if<Error>(&text)) return std::move(*error);
   const StorebagFile reader(ports.propertyLists(), ports.json(), ports.cryptography());
-  const std::string& bytes = std::get<std::string>(text);
-  auto bag = reader.open(bytes, std::nullopt);
-  const size_t dot = path.rfind('.');
-  if (std::holds_alternative<Error>(bag))
-    bag = reader.read(bytes, dot == std::string::npos ? "" : path.substr(dot + 1));
-  if (auto* error = std::get_if<Error>(&bag))
-    return Error{error->domain, error->code, path + ": " + error->localizedDescription};
+  auto bag = reader.openOrRead(path);
+  if (auto* error = std::get_if<Error>(&bag)) return std::move(*error);
   if (const Dictionary* section = std::get<Dictionary>(bag).dictionary("release")) return *section;
   return Error{"KYTToolsErrorDomain", -1, path + ": there is no section \"release\""};
 }

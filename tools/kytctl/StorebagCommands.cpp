@@ -7,25 +7,18 @@
 #include <cstdio>
 #include <cstring>
 
+#include "config/StorebagGuard.h"
 #include "platform/base/TextEscape.h"
-#include "platform/linux/data/OpenSSLCryptography.h"
-#include "platform/linux/data/PugixmlPropertyLists.h"
-#include "platform/linux/data/RapidJSON.h"
+#include "platform/linux/base/LinuxClock.h"
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/StorebagServices.h"
 
 namespace kyt::tools {
 
 namespace {
 
-struct Services {
-  PugixmlPropertyLists propertyLists;
-  RapidJSON json;
-  OpenSSLCryptography cryptography;
-  StorebagFile file{propertyLists, json, cryptography};
-};
-
-std::variant<Dictionary, Error> openDocument(Services& services, const std::string& path,
+std::variant<Dictionary, Error> openDocument(StorebagServices& services, const std::string& path,
                                              const std::string& publicKeyPath) {
   auto document = readFile(path);
   if (auto* error = std::get_if<Error>(&document)) return std::move(*error);
@@ -78,18 +71,36 @@ int makeKeysCommand(const std::string& folder, unsigned bits) {
   return 0;
 }
 
-int signCommand(const SignOptions& options) {
-  Services services;
+std::variant<Dictionary, Error> bagToSign(StorebagServices& services, const SignOptions& options) {
   auto text = readFile(options.bag);
-  if (auto* error = std::get_if<Error>(&text)) return failed(*error);
-  auto key = readFile(options.key);
-  if (auto* error = std::get_if<Error>(&key)) return failed(*error);
+  if (auto* error = std::get_if<Error>(&text)) return std::move(*error);
   const size_t dot = options.bag.rfind('.');
-  const std::string format = dot == std::string::npos ? "" : options.bag.substr(dot + 1);
-  auto bag = services.file.read(std::get<std::string>(text), format);
-  if (auto* error = std::get_if<Error>(&bag)) return failed(options.bag + ": " + error->localizedDescription);
-  printWarnings(std::get<Dictionary>(bag));
-  auto document = services.file.sign(std::get<Dictionary>(bag), std::get<std::string>(key));
+  auto read = services.file.read(std::get<std::string>(text),
+                                 dot == std::string::npos ? "" : options.bag.substr(dot + 1));
+  if (auto* error = std::get_if<Error>(&read)) {
+    error->localizedDescription = options.bag + ": " + error->localizedDescription;
+    return std::move(*error);
+  }
+  Dictionary& bag = std::get<Dictionary>(read);
+  if (options.serial) bag.set(kStorebagSerial, int64_t{*options.serial});
+  if (options.expiresInDays)
+    bag.set(kStorebagExpires, LinuxClock().timeOfDay().seconds + int64_t{*options.expiresInDays} * 86400);
+  printWarnings(bag);
+  return read;
+}
+
+std::variant<std::string, Error> signedWith(StorebagServices& services, const SignOptions& options,
+                                            const Dictionary& bag) {
+  auto key = readFile(options.key);
+  if (auto* error = std::get_if<Error>(&key)) return std::move(*error);
+  return services.file.sign(bag, std::get<std::string>(key));
+}
+
+int signCommand(const SignOptions& options) {
+  StorebagServices services;
+  auto bag = bagToSign(services, options);
+  if (auto* error = std::get_if<Error>(&bag)) return failed(*error);
+  auto document = signedWith(services, options, std::get<Dictionary>(bag));
   if (auto* error = std::get_if<Error>(&document)) return failed(*error);
   const std::string& bytes = std::get<std::string>(document);
   if (options.output == "-")
@@ -99,7 +110,7 @@ int signCommand(const SignOptions& options) {
 }
 
 int verifyCommand(const std::string& document, const std::string& publicKey) {
-  Services services;
+  StorebagServices services;
   auto bag = openDocument(services, document, publicKey);
   if (auto* error = std::get_if<Error>(&bag)) return failed(document + ": " + error->localizedDescription);
   const Value* version = std::get<Dictionary>(bag).find("version");
@@ -109,7 +120,7 @@ int verifyCommand(const std::string& document, const std::string& publicKey) {
 }
 
 int showCommand(const std::string& document, const std::string& publicKey) {
-  Services services;
+  StorebagServices services;
   auto bag = openDocument(services, document, publicKey);
   if (auto* error = std::get_if<Error>(&bag)) return failed(document + ": " + error->localizedDescription);
   std::string text;

@@ -25,8 +25,11 @@ struct Arguments {
   CheckOptions check;
   ExplainOptions explain;
   SimulateOptions simulate;
+  PublishOptions publish;
+  ProbeOptions probe;
+  RingOptions ring;
   WatchOptions watch;
-  std::string script, domain, key, value, type = "string", folder, document, publicKey;
+  std::string script, domain, key, value, type = "string", folder, document, publicKey, oldBag, newBag;
   unsigned bits = 2048;
   std::string level;
   bool json = false;
@@ -59,6 +62,12 @@ constexpr char kExplained[] =
   {"Category":10,"Type":1,"Payload":{"step":1},"Flag":0}
 Nothing is sent and nothing is stored; no daemon needs to run. What servers answer is not known here.
 The exit status is 0 when the event leaves, 1 when it does not, and 2 when that cannot be told.)";
+
+constexpr char kRing[] =
+    R"(Each device is in one of 100 rings, 00 to 99, which its identifier decides for good. A server that has an address for
+each ring can hand out a bag to some of them first:
+  kytctl ring --set 'https://bags.example.org/{ring}/bags/tolvar'
+stores the ring's address as the user default kytreporting_storebag_url.)";
 
 constexpr char kSimulated[] =
     R"(Besides the steps of kytctl session there is one that says what devices there are, with weights:
@@ -180,6 +189,40 @@ void addEntitlements(const Command& program, Arguments& a) {
   check.runs([&a] { a.status = entitlementsCheckCommand(a.connection.root, a.check); });
 }
 
+// What is signed, and what of it the command line decides.
+void addSigning(const Command& command, SignOptions& options) {
+  command.option("bag", options.bag, "FILE.json, FILE.toml or FILE.plist").required();
+  command.option("--key", options.key, "The private key, PEM").required();
+  command.option("--serial", options.serial, "The bag's serial, which grows from bag to bag");
+  command.option("--expires-in-days", options.expiresInDays, "The bag's expiry, in days from now");
+}
+
+// On their way to devices.
+void addRollOut(const Command& program, const Command& bag, Arguments& a) {
+  const Command publish = bag.command("publish", "Sign a bag and put it where a server hands it out");
+  addSigning(publish, a.publish.sign);
+  publish.option("--to", a.publish.folder, "The folder that the server hands out").required();
+  publish.option("--name", a.publish.name, "The storebag's name; without it the file's, without its ending");
+  publish.runs([&a] { a.status = publishCommand(a.publish); });
+  const Command diff = bag.command("diff", "Tell what changes when one bag takes the place of another");
+  diff.option("old", a.oldBag, "A document, or a bag (.json, .toml or .plist)").required();
+  diff.option("new", a.newBag, "A document, or a bag (.json, .toml or .plist)").required();
+  diff.runs([&a] { a.status = diffCommand(a.oldBag, a.newBag); });
+  const Command probe = bag.command("probe", "Ask a server as the daemon does, and tell what it gets wrong");
+  probe.option("url", a.probe.url, "The storebag's address, as https://bags.example.org/bags/tolvar/dulvek")
+      .required();
+  probe.option("--public-key", a.probe.publicKey, "The public key, instead of the device's");
+  probe.option("--ca-file", a.probe.caFile, "Trusted authorities, PEM, instead of the device's");
+  probe.runs([&a] { a.status = probeCommand(a.connection.root, a.probe); });
+
+  const Command ring =
+      program.command("ring", "Print in which of 100 rings this device is, or set its address");
+  ring.option("--identifier", a.ring.identifier, "Of another device, as it reports it");
+  ring.option("--set", a.ring.address, "Take storebags from this address from now on; {ring} is the ring");
+  ring.ends(kRing);
+  ring.runs([&a] { a.status = ringCommand(a.connection.root, a.ring); });
+}
+
 void addStorebag(const Command& program, Arguments& a) {
   const Command keys = program.command("keys", "Keys for signing storebags");
   keys.needsCommand();
@@ -191,8 +234,7 @@ void addStorebag(const Command& program, Arguments& a) {
   const Command bag = program.command("storebag", "Signed configurations");
   bag.needsCommand();
   const Command sign = bag.command("sign", "Sign a bag into the document that servers hand out");
-  sign.option("bag", a.sign.bag, "FILE.json, FILE.toml or FILE.plist").required();
-  sign.option("--key", a.sign.key, "The private key, PEM").required();
+  addSigning(sign, a.sign);
   sign.option("-o,--output", a.sign.output, "The document; - for standard output").required();
   sign.runs([&a] { a.status = signCommand(a.sign); });
   const Command verify = bag.command("verify", "Check a document's signature");
@@ -214,6 +256,7 @@ void addStorebag(const Command& program, Arguments& a) {
   simulate.flag("--json", a.simulate.json, "Print one JSON object");
   simulate.ends(kSimulated);
   simulate.runs([&a] { a.status = simulateCommand(a.connection.root, a.simulate); });
+  addRollOut(program, bag, a);
 }
 
 void addWindow(const Command& program, Arguments& a) {

@@ -8,7 +8,8 @@ function __kytctl_words
             set value 0
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
                 --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
-                --service --storebag --draw --events --devices --seed
+                --service --storebag --draw --events --devices --seed \
+                --serial --expires-in-days --to --name --ca-file --identifier --set
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -78,6 +79,7 @@ complete -c kytctl -n __kytctl_at -a storebags -d 'Which storebags are in force'
 complete -c kytctl -n __kytctl_at -a metrics -d 'Figures in the OpenMetrics text format'
 complete -c kytctl -n __kytctl_at -a log-level -d 'What the running daemon logs'
 complete -c kytctl -n __kytctl_at -a reload -d 'Let the running daemon take up settings'
+complete -c kytctl -n __kytctl_at -a ring -d 'In which of 100 rings this device is'
 complete -c kytctl -n __kytctl_at -a watch -d 'Events as they pass'
 complete -c kytctl -n '__kytctl_at -b watch' -l user -x -a '(__fish_complete_users)' -d 'Of the programs of this user'
 complete -c kytctl -n '__kytctl_at -b watch' -l client -x -d 'Of clients of this name'
@@ -93,7 +95,7 @@ complete -c kytctl -n '__kytctl_at owner' -a 'show export erase'
 complete -c kytctl -n '__kytctl_at -b owner show' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
-complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate'
+complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate publish diff probe'
 
 for command in send session
     complete -c kytctl -n "__kytctl_at -b $command" -l socket -r -F -d 'The socket of the daemon'
@@ -128,13 +130,23 @@ complete -c kytctl -n '__kytctl_at -b entitlements check' -l pid -x -a '(__fish_
 complete -c kytctl -n '__kytctl_at -b entitlements check' -l user -x -a '(__fish_complete_users)' -d 'Any process of a user'
 complete -c kytctl -n '__kytctl_at -b keys make' -l bits -x -d 'Length of the key, 2048 to 16384'
 complete -c kytctl -n '__kytctl_at keys make' -a '(__fish_complete_directories)'
-complete -c kytctl -n '__kytctl_at -b storebag sign' -l key -r -F -d 'The private key'
+for command in sign publish
+    complete -c kytctl -n "__kytctl_at -b storebag $command" -l key -r -F -d 'The private key'
+    complete -c kytctl -n "__kytctl_at -b storebag $command" -l serial -x -d 'Grows from bag to bag'
+    complete -c kytctl -n "__kytctl_at -b storebag $command" -l expires-in-days -x -d 'The expiry'
+end
+complete -c kytctl -n '__kytctl_at -b storebag publish' -l to -x -a '(__fish_complete_directories)' -d 'What a server hands out'
+complete -c kytctl -n '__kytctl_at -b storebag publish' -l name -x -d 'Of the storebag'
+complete -c kytctl -n '__kytctl_at -b storebag probe' -l ca-file -r -F -d 'Trusted authorities'
+complete -c kytctl -n '__kytctl_at -b ring' -l identifier -x -d 'Of another device'
+complete -c kytctl -n '__kytctl_at -b ring' -l set -x -d 'Take storebags from here'
 complete -c kytctl -n '__kytctl_at -b storebag sign' -s o -l output -r -F -d 'The document'
-for command in verify show
+for command in verify show probe
     complete -c kytctl -n "__kytctl_at -b storebag $command" -l public-key -r -F -d 'The public key'
 end
 complete -c kytctl -n '__kytctl_at -b storebag simulate' -l events -r -F -d 'Sessions and events'
 complete -c kytctl -n '__kytctl_at -b storebag simulate' -l devices -x -d 'How many devices'
 complete -c kytctl -n '__kytctl_at -b storebag simulate' -l seed -x -d 'The same seed gives the same figures'
 complete -c kytctl -n '__kytctl_at -b storebag simulate' -l json -d 'Print JSON'
-complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show" "storebag simulate"' -F
+complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show" "storebag simulate" "storebag publish" "storebag diff"' -F
+complete -c kytctl -n '__kytctl_due 2 "storebag diff"' -F
