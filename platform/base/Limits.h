@@ -55,6 +55,10 @@ struct Limits {
   // descriptor, and clients that come and go start them faster than servers answer.
   static constexpr size_t maxActiveRequests = 1024;
   static constexpr size_t maxActiveRequestsToOneServer = 512;  // one without answers leaves others room
+  // Of one user to one server: so many requests, and further ones while the bodies on their way have less than so many
+  // bytes. More is only waiting at a server that takes as long for each, and other users' requests come after it.
+  static constexpr size_t activeRequestsOfUserToOneServer = 16;
+  static constexpr size_t smallRequestBytesOfUserToOneServer = 1u << 20;
   static constexpr size_t maxWorkers = 512;                    // threads
   static constexpr size_t maxWorkersPerUser = maxWorkers / 2;  // blocked ones of one user leave others some
   static constexpr size_t maxHandshakeBytes = 16384;           // before authentication

@@ -25,6 +25,13 @@ class OwnerLines {
   void push(Item item);
   void pushFirst(Item item);  // before all others, of whatever owner
   [[nodiscard]] Item pop();   // null when there is none
+  // The first one of the owners of which `mayGo(owner)` is true; the others keep their turn.
+  template <typename MayGo>
+  [[nodiscard]] Item pop(MayGo mayGo);
+  template <typename MayGo>
+  [[nodiscard]] bool has(MayGo mayGo) const {
+    return std::any_of(turns_.begin(), turns_.end(), mayGo);
+  }
   [[nodiscard]] bool empty() const { return count_ == 0; }
   [[nodiscard]] size_t size() const { return count_; }
   [[nodiscard]] std::vector<Item> takeAll();
@@ -59,9 +66,16 @@ void OwnerLines<Owned>::pushFirst(Item item) {
 
 template <typename Owned>
 typename OwnerLines<Owned>::Item OwnerLines<Owned>::pop() {
-  if (turns_.empty()) return nullptr;
-  const uint64_t owner = turns_.front();
-  turns_.pop_front();
+  return pop([](uint64_t) { return true; });
+}
+
+template <typename Owned>
+template <typename MayGo>
+typename OwnerLines<Owned>::Item OwnerLines<Owned>::pop(MayGo mayGo) {
+  const auto turn = std::find_if(turns_.begin(), turns_.end(), mayGo);
+  if (turn == turns_.end()) return nullptr;
+  const uint64_t owner = *turn;
+  turns_.erase(turn);
   const auto found = lines_.find(owner);
   std::deque<Item>& line = found->second;
   Item item = std::move(line.front());

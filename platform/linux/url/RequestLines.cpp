@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "platform/base/Limits.h"
 #include "platform/linux/url/URLTransfer.h"
 
 namespace kyt {
@@ -18,44 +19,62 @@ std::string_view serverName(const URLTransfer& transfer) {
 
 }  // namespace
 
+bool RequestLines::Server::hasRoomFor(uint64_t owner) const {
+  const auto user = users.find(owner);
+  return user == users.end() || user->second.requests < Limits::activeRequestsOfUserToOneServer ||
+         user->second.bytes < Limits::smallRequestBytesOfUserToOneServer;
+}
+
 bool RequestLines::mayGo(URLTransfer& transfer) {
   Server& server = serverOf(transfer)->second;
   // One with an end of its own (a storebag's) has no time to wait, and there are few of them.
-  if (!transfer.request.timeout && (inLine_ > 0 || active_ >= most_ || server.active >= mostToOneServer_)) {
+  if (!transfer.request.timeout && (inLine_ > 0 || active_ >= most_ || server.active >= mostToOneServer_ ||
+                                    !server.hasRoomFor(transfer.owner()))) {
     server.line.push(transfer.self);
     ++inLine_;
     return false;
   }
-  ++active_;
-  ++server.active;
+  count(transfer, server);
   return true;
 }
 
-void RequestLines::goesAgain(const URLTransfer& transfer) {
+void RequestLines::count(URLTransfer& transfer, Server& server) {
   ++active_;
-  ++serverOf(transfer)->second.active;
+  ++server.active;
+  OnTheWay& user = server.users[transfer.owner()];
+  transfer.countedBytes = transfer.request.body.size();
+  ++user.requests;
+  user.bytes += transfer.countedBytes;
+}
+
+void RequestLines::goesAgain(URLTransfer& transfer) {
+  count(transfer, serverOf(transfer)->second);
 }
 
 void RequestLines::hasGone(const URLTransfer& transfer) {
   const auto found = servers_.find(serverName(transfer));
   --active_;
   --found->second.active;
+  const auto user = found->second.users.find(transfer.owner());
+  user->second.bytes -= transfer.countedBytes;
+  if (--user->second.requests == 0) found->second.users.erase(user);
   forgetIfUnused(found);
 }
 
 std::shared_ptr<URLTransfer> RequestLines::next() {
   while (inLine_ > 0 && active_ < most_) {
-    const auto server = nextServer();
-    if (server == servers_.end()) return nullptr;
-    std::shared_ptr<URLTransfer> transfer = server->second.line.pop();
+    const auto found = nextServer();
+    if (found == servers_.end()) return nullptr;
+    Server& server = found->second;
+    std::shared_ptr<URLTransfer> transfer =
+        server.line.pop([&server](uint64_t owner) { return server.hasRoomFor(owner); });
     --inLine_;
     if (transfer->phase == URLTransfer::Phase::inLine) {
-      server->second.lastTurn = ++turns_;
-      ++active_;
-      ++server->second.active;
+      server.lastTurn = ++turns_;
+      count(*transfer, server);
       return transfer;
     }
-    forgetIfUnused(server);
+    forgetIfUnused(found);
   }
   return nullptr;
 }
@@ -70,7 +89,8 @@ RequestLines::Servers::iterator RequestLines::nextServer() {
   auto best = servers_.end();
   for (auto server = servers_.begin(); server != servers_.end(); ++server) {
     const Server& one = server->second;
-    if (one.line.empty() || one.active >= mostToOneServer_) continue;
+    if (one.active >= mostToOneServer_) continue;
+    if (!one.line.has([&one](uint64_t owner) { return one.hasRoomFor(owner); })) continue;
     if (best == servers_.end() ||
         std::pair(one.active, one.lastTurn) < std::pair(best->second.active, best->second.lastTurn))
       best = server;

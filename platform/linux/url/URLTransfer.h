@@ -102,6 +102,7 @@ class URLTransfer final : public URLTask, public std::enable_shared_from_this<UR
   URLConnectionPool* pool = nullptr;  // while active
   Attempt attempt;
   size_t waitingCharge = 0;      // while waiting
+  size_t countedBytes = 0;       // RequestLines's, while it is on its way
   size_t outstandingCharge = 0;  // until its result is set
   MonotonicTime started;
   Deadline deadline;
