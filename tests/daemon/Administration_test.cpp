@@ -1,6 +1,7 @@
 // What administrators see, over sessions with recording back ends: the daemon's own classes behind it are real.
 #include "daemon/Administration.h"
 
+#include "platform/base/Watchers.h"
 #include "platform/ipc/AdministrationInterface.h"
 #include "tests/daemon/AgentFixture.h"
 
@@ -23,6 +24,39 @@ class AdministrationTest : public AgentFixture {
   }
   static const char* refusalOf(const std::shared_ptr<FakeConnection>& connection) {
     return std::dynamic_pointer_cast<AdministrationInterface>(connection->anyExportedObject())->refusal();
+  }
+  // What one watcher is told; its connection's.
+  struct Told {
+    std::vector<Dictionary> events;
+    bool takes = true;  // the peer reads
+  };
+  // The refusal, or none.
+  static std::optional<WatchRefusal> watch(const std::shared_ptr<FakeConnection>& connection,
+                                           const Dictionary& filter,
+                                           const std::shared_ptr<Told>& told = std::make_shared<Told>()) {
+    std::optional<WatchRefusal> refusal;
+    connection->queue()->sync([&] {
+      auto window = std::dynamic_pointer_cast<AdministrationInterface>(connection->anyExportedObject());
+      refusal = window->watch(filter, [told](const Dictionary& passed) {
+        if (told->takes) told->events.push_back(passed);
+        return told->takes;
+      });
+    });
+    return refusal;
+  }
+  void pass(int32_t category, uint32_t user = 1000) {
+    PassedEvent event;
+    event.program = {user, 7, "a", "s"};
+    event.kind = {category, 1};
+    test_.books.watchers()->tell(std::move(event));
+  }
+  void letWatchersLook() {
+    test_.timers.advance(Limits::watchPeriod, [this] { test_.executor.runAll(); });
+  }
+  static std::vector<int> categories(const Told& told) {
+    std::vector<int> all;
+    for (const Dictionary& event : told.events) all.push_back(event.integer("category"));
+    return all;
   }
   static const Dictionary& backEnd(const Dictionary& session, size_t number = 0) {
     return *(session.array("backEnds")->begin() + number)->dictionary();
@@ -165,6 +199,129 @@ TEST_F(AdministrationTest, SetsTheLogLevel) {
   EXPECT_FALSE(test_.log.enabled(LogLevel::normal));
   EXPECT_EQ(administration_.setLogLevel("debug"), std::nullopt);
   EXPECT_TRUE(test_.log.debugEnabled());
+}
+
+TEST_F(AdministrationTest, ShowsBodiesToRootAndTheDaemonsUserAlone) {
+  const Dictionary withBodies{{"bodies", true}};
+  EXPECT_EQ(watch(look(0), withBodies), std::nullopt);
+  EXPECT_EQ(watch(look(500), withBodies), std::nullopt);
+  const auto member = look(1000, {4});
+  const auto refused = watch(member, withBodies);
+  ASSERT_NE(refused, std::nullopt);
+  EXPECT_EQ(refused->why, WatchRefusal::Why::notAllowed);
+  EXPECT_EQ(refused->text, "Only root and the daemon's own user may see what is in events");
+  EXPECT_EQ(watch(member, {{"bodies", false}}), std::nullopt);
+}
+
+TEST_F(AdministrationTest, KeepsNoBodyWhileThoseWatchWhoMayNotSeeOne) {
+  const auto told = std::make_shared<Told>();
+  ASSERT_EQ(watch(look(1000, {4}), {}, told), std::nullopt);
+  const auto post = std::make_shared<WatchedPost>(test_.books.watchers());
+  post->leaves("https://a", "what-is-in-it");
+  EXPECT_EQ(post->body(), "");
+  // Nor is one told that is kept for somebody else.
+  ASSERT_EQ(watch(look(0), {{"bodies", true}}), std::nullopt);
+  const auto kept = std::make_shared<WatchedPost>(test_.books.watchers());
+  kept->leaves("https://a", "what-is-in-it");
+  ASSERT_EQ(kept->body(), "what-is-in-it");
+  PassedEvent event;
+  event.post = kept;
+  event.isFirstOfPost = true;
+  test_.books.watchers()->tell(std::move(event));
+  letWatchersLook();
+  ASSERT_EQ(told->events.size(), 1U);
+  EXPECT_EQ(told->events[0].find("body"), nullptr);
+  EXPECT_EQ(told->events[0].find("bodyBytes"), nullptr);
+  EXPECT_EQ(*told->events[0].string("server"), "https://a");
+}
+
+TEST_F(AdministrationTest, RefusesAFilterThatItDoesNotUnderstand) {
+  const auto connection = look(0);
+  const std::pair<Dictionary, std::string_view> wrong[] = {
+      {{{"users", 5}}, "the filter's keys are"},
+      {{{"User", 5}}, "the filter's keys are"},
+      {{{"", 5}}, "the filter's keys are"},
+      {{{"user", "root"}}, "\"user\" must be"},
+      {{{"user", -1}}, "\"user\" must be"},
+      {{{"user", int64_t{1} << 32}}, "\"user\" must be"},
+      {{{"user", 1.0}}, "\"user\" must be"},
+      {{{"client", 5}}, "\"client\" must be"},
+      {{{"category", 65536}}, "\"category\" must be"},
+      {{{"category", "5"}}, "\"category\" must be"},
+      {{{"category", true}}, "\"category\" must be"},
+      {{{"bodies", 1}}, "\"bodies\" must be"},
+      {{{"category", 5}, {"bodies", "true"}}, "\"bodies\" must be"},
+  };
+  for (const auto& [filter, problem] : wrong) {
+    const auto refused = watch(connection, filter);
+    ASSERT_NE(refused, std::nullopt) << description(filter);
+    EXPECT_EQ(refused->why, WatchRefusal::Why::wrongFilter) << description(filter);
+    EXPECT_TRUE(refused->text.starts_with(problem)) << refused->text;
+  }
+  EXPECT_FALSE(test_.books.watchers()->anybody());
+  EXPECT_EQ(watch(connection, {{"user", uint64_t{4294967295}}, {"category", 65535}, {"client", ""}}),
+            std::nullopt);
+}
+
+TEST_F(AdministrationTest, PutsTheFilterOfASecondWatchInPlaceOfTheFirst) {
+  const auto connection = look(0);
+  const auto first = std::make_shared<Told>(), second = std::make_shared<Told>();
+  ASSERT_EQ(watch(connection, {{"category", 5}}, first), std::nullopt);
+  pass(5);
+  letWatchersLook();
+  // More often than there are places for watchers: each call gives its own back.
+  for (size_t i = 0; i <= Limits::maxWatchers; ++i)
+    ASSERT_EQ(watch(connection, {{"category", 6}}, second), std::nullopt);
+  pass(5);
+  pass(6);
+  letWatchersLook();
+  EXPECT_EQ(categories(*first), std::vector<int>{5});
+  EXPECT_EQ(categories(*second), std::vector<int>{6});
+}
+
+TEST_F(AdministrationTest, LeavesTheFirstFilterWhereASecondIsRefused) {
+  const auto connection = look(0);
+  const auto told = std::make_shared<Told>();
+  ASSERT_EQ(watch(connection, {{"category", 5}}, told), std::nullopt);
+  ASSERT_NE(watch(connection, {{"categories", 6}}), std::nullopt);
+  pass(5);
+  pass(6);
+  letWatchersLook();
+  EXPECT_EQ(categories(*told), std::vector<int>{5});
+}
+
+TEST_F(AdministrationTest, WatchesNoMoreForAConnectionThatHasEnded) {
+  const auto connection = look(0);
+  ASSERT_EQ(watch(connection, {}), std::nullopt);
+  EXPECT_TRUE(test_.books.watchers()->anybody());
+  connection->invalidateNow();
+  EXPECT_FALSE(test_.books.watchers()->anybody());
+}
+
+TEST_F(AdministrationTest, TellsAWatcherThatReadsAgainHowManyItMissedAndOthersAll) {
+  const auto deaf = std::make_shared<Told>(), quick = std::make_shared<Told>();
+  ASSERT_EQ(watch(look(0), {}, deaf), std::nullopt);
+  ASSERT_EQ(watch(look(500), {}, quick), std::nullopt);
+  deaf->takes = false;
+  const auto most = static_cast<int>(Limits::maxWatchedEvents);
+  const int all = 3 * most;
+  for (int i = 0; i < all; ++i) {
+    pass(i);
+    if (i % 100 == 99) letWatchersLook();
+  }
+  letWatchersLook();
+  ASSERT_EQ(quick->events.size(), static_cast<size_t>(all));
+  for (const Dictionary& event : quick->events) EXPECT_EQ(event.find("lost"), nullptr);
+  EXPECT_TRUE(deaf->events.empty());
+  deaf->takes = true;
+  letWatchersLook();
+  letWatchersLook();
+  int64_t lost = 0;
+  for (const Dictionary& event : deaf->events)
+    if (const Value* number = event.find("lost")) lost += number->longLongValue();
+  EXPECT_EQ(static_cast<int64_t>(deaf->events.size()) + lost, all);
+  EXPECT_EQ(deaf->events.size(), Limits::maxWatchedEvents + 1);  // one was on its way to the peer
+  EXPECT_EQ(deaf->events[0].integer("category"), 0);
 }
 
 }  // namespace

@@ -1,10 +1,12 @@
 // kytctl watch against the built daemon, in both forms, and a watcher that reads nothing.
+#include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <functional>
 #include <memory>
@@ -47,6 +49,7 @@ class KytctlWatch : public StageTest {
     bool shows(const std::string& wanted) const {
       return eventually([&] { return text().find(wanted) != std::string::npos; });
     }
+    void signal(int number) const { child_->signal(number); }
     int wait() { return child_->wait(std::chrono::seconds(30)).value_or(-1); }
 
    private:
@@ -177,6 +180,44 @@ TEST_F(KytctlWatch, LetsFourWatchAndTakesAnotherWhereOneHasGone) {
     Running next(root(), {});
     return eventually([&] { return !next.text().empty(); }) && next.text().find("FATE") != std::string::npos;
   }));
+}
+
+// Stopped while far more passes than its ring and its socket hold, then let go on.
+TEST_F(KytctlWatch, SaysHowManyPassedWhileItDidNotReadAndAddsUp) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  Running stopped(root(), {}), quick(root(), {});
+  ASSERT_TRUE(stopped.shows("FATE")) << stopped.text();
+  ASSERT_TRUE(quick.shows("FATE")) << quick.text();
+  stopped.signal(SIGSTOP);
+  TestClient client(socket(), 7, "unlisted");
+  EXPECT_EQ(client.configure(), "live:");
+  constexpr int kEvents = 12000;
+  for (int i = 0; i < kEvents; ++i) {
+    ASSERT_TRUE(client.send(5, 1, {}));
+    if (i % 500 == 499) {
+      ASSERT_EQ(client.displayURL(), "https://display.example.org/");
+    }
+  }
+  stopped.signal(SIGCONT);
+  const auto told = [](const Running& watch) {
+    long long sum = 0;
+    for (const std::string& line : watch.lines()) {
+      const bool isLoss = line.find(" were not told: more passed than was read here") != std::string::npos;
+      sum += isLoss ? std::atoll(line.c_str()) : line.find("/1 ") != std::string::npos ? 1 : 0;
+    }
+    return sum;
+  };
+  // What is lost is told with what is told next: now and then one more event.
+  int all = kEvents, looks = 0;
+  EXPECT_TRUE(eventually([&] {
+    if (told(stopped) == all && told(quick) == all) return true;
+    if (looks++ % 50 == 49 && client.send(6, 1, {})) ++all;
+    return false;
+  })) << told(stopped)
+      << " and " << told(quick) << " of " << all;
+  EXPECT_NE(stopped.text().find(" were not told"), std::string::npos);
 }
 
 // A peer of the administration socket that asks to watch and never reads.

@@ -99,6 +99,26 @@ TEST_F(Window, IsOpenToTheGroupThatTheSettingsName) {
   EXPECT_NE(call("Status", asNobody()).status, 0);
 }
 
+TEST_F(Window, LetsTheGroupWatchWithoutBodies) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root";
+  const group* adm = ::getgrnam("adm");
+  if (adm == nullptr) GTEST_SKIP() << "there is no group adm";
+  start("[admin]\ngroup = \"adm\"\n");
+  openTheWay();
+  const std::vector<std::string> member = asNobody(std::to_string(adm->gr_gid));
+  const ProgramRun without = call("Watch", member, {"{'category': <uint16 5>}"});
+  EXPECT_EQ(without.status, 0) << without.text;
+  const ProgramRun bodies = call("Watch", member, {"{'bodies': <true>}"});
+  EXPECT_NE(bodies.status, 0);
+  EXPECT_NE(bodies.text.find("org.freedesktop.DBus.Error.AccessDenied: Only root and the daemon's own user "
+                             "may see what is in events"),
+            std::string::npos)
+      << bodies.text;
+  EXPECT_EQ(call("Watch", {}, {"{'bodies': <true>}"}).status, 0);
+  const ProgramRun wrong = call("Watch", {}, {"{'kind': <5>}"});
+  EXPECT_NE(wrong.text.find("InvalidArgs: the filter's keys are"), std::string::npos) << wrong.text;
+}
+
 TEST_F(Window, RefusesWhoeverReachesItInSpiteOfItsMode) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root";
   start();
@@ -113,6 +133,9 @@ TEST_F(Window, RefusesWhoeverReachesItInSpiteOfItsMode) {
         << refused.text;
   }
   EXPECT_NE(call("SetLogLevel", asNobody(), {"error"}).status, 0);
+  const ProgramRun watching = call("Watch", asNobody(), {"@a{sv} {}"});
+  EXPECT_NE(watching.text.find("org.freedesktop.DBus.Error.AccessDenied"), std::string::npos)
+      << watching.text;
   EXPECT_EQ(call("Status").status, 0);
 }
 

@@ -153,6 +153,33 @@ TEST(MessageWriter, WritesRepliesAndErrors) {
   EXPECT_EQ(reader.finish(), BodyStatus::ok);
 }
 
+TEST(MessageWriter, WritesSignals) {
+  std::string bytes;
+  MessageWriter writer(bytes);
+  writer.beginSignal(5, "/a/b", "c.d", "Passed", "a{sv}");
+  writer.writeDictionary(test::samplePayload());
+  ASSERT_TRUE(writer.end());
+  for (const std::string& form : {bytes, test::ByteOrderSwapper::swapped(bytes)}) {
+    Message message;
+    const Frame read = frame(form, message);
+    ASSERT_EQ(read.status, FrameStatus::complete) << read.problem;
+    EXPECT_EQ(read.size, form.size());
+    EXPECT_EQ(message.type, wire::MessageType::signal);
+    EXPECT_FALSE(message.expectsReply());
+    EXPECT_EQ(message.serial, 5U);
+    EXPECT_EQ(message.path, "/a/b");
+    EXPECT_EQ(message.interface, "c.d");
+    EXPECT_EQ(message.member, "Passed");
+    EXPECT_EQ(message.signature, "a{sv}");
+    EXPECT_TRUE(validateBody(message));
+    BodyReader reader(message);
+    Dictionary passed;
+    ASSERT_TRUE(reader.readDictionary(passed));
+    EXPECT_EQ(reader.finish(), BodyStatus::ok);
+    EXPECT_EQ(passed, test::samplePayload());
+  }
+}
+
 TEST(MessageWriter, ObjectsReadBackTheSameInBothByteOrders) {
   const Dictionary payload = test::samplePayload();
   const std::string bytes = call("a{sv}", [&](MessageWriter& w) { w.writeDictionary(payload); });
