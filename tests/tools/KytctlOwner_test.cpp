@@ -83,7 +83,7 @@ TEST_F(KytctlOwner, SeesNothingOnADeviceThatReportedNothing) {
   EXPECT_TRUE(has(run.text, "Nothing left the device since records are kept\n")) << run.text;
   EXPECT_TRUE(has(run.text, "Identifiers: none\n")) << run.text;
   EXPECT_TRUE(has(run.text, "upload: not given\n")) << run.text;
-  EXPECT_TRUE(has(run.text, "Waiting: nothing, the daemon does not run\n")) << run.text;
+  EXPECT_TRUE(has(run.text, "Waiting: nothing in memory, the daemon does not run\n")) << run.text;
   EXPECT_TRUE(has(run.text, "Message log: none\n")) << run.text;
 }
 
@@ -115,6 +115,45 @@ TEST_F(KytctlOwner, SeesWhatLeftByProgramAndServerAndTheIdentifiers) {
   for (const Value& one : list(all, "identifiers"))
     EXPECT_GT(one.dictionary()->find("made")->doubleValue(), 1e9);
   EXPECT_EQ(list(all, "logs").size(), 1U) << "with consent what was posted stands there";
+}
+
+TEST_F(KytctlOwner, SeesWhatWaitsByProgramAndPlace) {
+  start();
+  TestClient client(socket(), 8, "person");
+  ASSERT_EQ(client.configure(), "live: httppost");
+  ASSERT_EQ(client.flush(), "flushed");  // the start of the session
+  EXPECT_TRUE(has(kytctl({"owner", "show"}).text, "Waiting: nothing, of the daemon that runs (process "));
+  for (int i = 0; i < 7; ++i) ASSERT_TRUE(client.send(5, 1, {}));
+  ASSERT_EQ(client.displayURL(), "https://display.example.org/") << "the daemon has them";
+  const Dictionary waiting = *shown().dictionary("waiting");
+  EXPECT_EQ(waiting.find("daemon")->longLongValue(), stage_->daemon()->pid());
+  EXPECT_EQ(waiting.find("problem"), nullptr);
+  const Array rows = list(waiting, "rows");
+  ASSERT_EQ(rows.size(), 1U) << description(waiting);
+  const Dictionary& row = *rows.begin()->dictionary();
+  EXPECT_EQ(*row.string("client"), "person");
+  EXPECT_EQ(*row.string("backEnd"), "httppost");
+  EXPECT_EQ(row.integer("user"), static_cast<int>(getuid()));
+  EXPECT_EQ(row.integer("batched"), 7);
+  for (const char* elsewhere : {"queued", "inFlight", "waiting", "outbox"})
+    EXPECT_EQ(row.integer(elsewhere), 0) << elsewhere;
+  const std::string text = kytctl({"owner", "show"}).text;
+  EXPECT_TRUE(has(text, "Waiting, of the daemon that runs (process ")) << text;
+  EXPECT_TRUE(has(text, "  7 in the batch\n")) << text;
+  client.close();
+  end();
+  const Dictionary after = *shown().dictionary("waiting");
+  EXPECT_TRUE(after.find("daemon")->isNull());
+  EXPECT_TRUE(list(after, "rows").empty());
+}
+
+TEST_F(KytctlOwner, IsToldThatADaemonDoesNotSayWhatWaits) {
+  start();
+  std::filesystem::remove(stage_->folder() + "/run/kytreportingd/admin");
+  const Dictionary waiting = *shown().dictionary("waiting");
+  EXPECT_TRUE(has(waiting.string("problem")->str(), "has no administration socket")) << description(waiting);
+  const ProgramRun run = kytctl({"owner", "show"});
+  EXPECT_TRUE(has(run.text, "has it in memory; how much it is cannot be told: ")) << run.text;
 }
 
 TEST_F(KytctlOwner, ReadsLinesOfAHundredCharacters) {

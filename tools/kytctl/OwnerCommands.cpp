@@ -26,6 +26,7 @@
 #include "platform/queues/Log.h"
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/WaitingEvents.h"
 
 namespace kyt::tools {
 
@@ -83,7 +84,8 @@ std::string fitted(std::string_view given, size_t width) {
 class Owner {
  public:
   explicit Owner(const std::string& root)
-      : paths_(Paths::of(root, "/")),
+      : root_(root),
+        paths_(Paths::of(root, "/")),
         defaults_({.folder = paths_.userDefaults()}, log_, counters_, clock_),
         table_(DepartureFile::read(paths_.userDefaults(), json_)) {
     table_.dropOld(clock_.timeOfDay().asSeconds());
@@ -104,12 +106,11 @@ class Owner {
                                     {"made", one.made > 0 ? Value(one.made) : Value()}});
     for (const MessageLog& one : logs_)
       logs.append(Dictionary{{"path", std::string_view(one.path)}, {"bytes", one.bytes}});
-    const pid_t daemon = DaemonLock::holder(paths_.userDefaults());
     return {{"consent", hasConsent()},
             {"since", since()},
             {"left", left()},
             {"identifiers", std::move(identifiers)},
-            {"waiting", Dictionary{{"daemon", daemon > 0 ? Value(static_cast<int64_t>(daemon)) : Value()}}},
+            {"waiting", WaitingEvents(root_).object()},
             {"logs", std::move(logs)}};
   }
 
@@ -117,12 +118,7 @@ class Owner {
     printLeft();
     printIdentifiers();
     std::printf("\nConsent to diagnostics-and-usage upload: %s\n", hasConsent() ? "granted" : "not given");
-    const pid_t daemon = DaemonLock::holder(paths_.userDefaults());
-    if (daemon > 0)
-      std::printf("Waiting: what it has not sent yet is in the memory of the daemon (process %d) alone\n",
-                  static_cast<int>(daemon));
-    else
-      std::printf("Waiting: nothing, the daemon does not run\n");
+    std::printf("%s", WaitingEvents(root_).text().c_str());
     for (const MessageLog& one : logs_)
       std::printf("Message log: %s, %s bytes\n", escapedText(one.path).c_str(), sizeText(one.bytes).c_str());
     if (logs_.empty()) std::printf("Message log: none\n");
@@ -327,6 +323,7 @@ class Owner {
       std::printf("  identifier %s\n", escapedText(one.value).c_str());
   }
 
+  const std::string root_;
   const Paths paths_;
   ComplaintSink sink_;
   Log log_{sink_};
