@@ -3,17 +3,16 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <map>
-#include <regex>
-#include <set>
 #include <sstream>
 #include <string>
 #include <variant>
 #include <vector>
 
+#include "platform/base/Limits.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/StageFixture.h"
+#include "tests/support/PlainClient.h"
 
 namespace kyt {
 namespace {
@@ -67,6 +66,22 @@ class KytctlWindow : public StageTest {
   static std::string text(const Dictionary& row, const char* key) {
     const String* text = row.string(key);
     return text != nullptr ? text->str() : "(none)";
+  }
+  // One event of another user's program.
+  void reportAsNobody() {
+    constexpr char kNobody[] = "65534";
+    ASSERT_FALSE(tools::writeFile(
+        stage_->folder() + "/etc/kytreportingd/entitlements.d/nobody.toml",
+        std::string("[[grant]]\nuser = ") + kNobody + "\n\"com.vantu.private.kytreportingd\" = true\n",
+        0644));
+    std::filesystem::permissions(stage_->folder(), std::filesystem::perms(0755));
+    std::filesystem::copy(stage_->program("kytctl"), stage_->folder() + "/kytctl");
+    const ProgramRun sent =
+        runProgram("setpriv", {std::string("--reuid=") + kNobody, std::string("--regid=") + kNobody,
+                               "--clear-groups", stage_->folder() + "/kytctl", "send", "--socket", socket(),
+                               "--client-type", "7", "--category", "5", "--type", "1", "--require-user-info",
+                               "--user-info", R"({"ClientName":"a","ServiceName":"s"})"});
+    EXPECT_EQ(sent.text, "finished\n");
   }
   // Two delivered events, the session's start among them, and one batched.
   void report(TestClient& client) {
@@ -181,49 +196,52 @@ TEST_F(KytctlWindow, IsNotConfusedByNamesOfAnyKind) {
   EXPECT_EQ(metrics.find("# EOF\n"), metrics.size() - 6);
 }
 
-// A strict reader of the format: the text's families in order, each with its type before its samples, no sample twice.
-TEST_F(KytctlWindow, PrintsMetricsInTheOpenMetricsFormat) {
+// A program may call itself anything in each message: that makes no more rows than a user may have, and none of another
+// user's program goes.
+TEST_F(KytctlWindow, ShowsBooksThatNoUserMakesGrowWithoutEnd) {
   lay();
   putBag("cadmor", {entry("a")});
   startDaemon();
-  TestClient client(socket(), 7, "a \"quoted\" \\ name\n");
-  EXPECT_EQ(client.configure(), "live:");
-  EXPECT_TRUE(client.send(5, 1, {}));
-  EXPECT_EQ(client.displayURL(), "https://display.example.org/");
-  const ProgramRun run = kytctl({"metrics"});
-  ASSERT_EQ(run.status, 0) << run.text;
-  const std::vector<std::string> lines = linesOf(run.text);
-  ASSERT_FALSE(lines.empty());
-  EXPECT_EQ(lines.back(), "# EOF");
-  const std::regex help("# HELP ([a-z_]+) [^\\n]+\\."), type("# TYPE ([a-z_]+) (counter|gauge)"),
-      unit("# UNIT ([a-z_]+) ([a-z]+)"),
-      sample(
-          R"(([a-z_]+)(\{[a-z_]+="(?:[^"\\]|\\[\\"n])*"(?:,[a-z_]+="(?:[^"\\]|\\[\\"n])*")*\})? ([0-9]+))");
-  std::set<std::string> families, samples;
-  std::string family, kind;
-  std::map<std::string, std::string> values;
-  for (size_t i = 0; i + 1 < lines.size(); ++i) {
-    std::smatch found;
-    if (std::regex_match(lines[i], found, help)) {
-      family = found[1];
-      kind.clear();
-      EXPECT_TRUE(families.insert(family).second) << "twice: " << family;
-    } else if (std::regex_match(lines[i], found, type)) {
-      EXPECT_EQ(found[1], family);
-      kind = found[2];
-    } else if (std::regex_match(lines[i], found, unit)) {
-      EXPECT_EQ(found[1], family);
-      EXPECT_TRUE(family.ends_with("_" + found[2].str())) << family;
-    } else {
-      ASSERT_TRUE(std::regex_match(lines[i], found, sample)) << lines[i];
-      EXPECT_EQ(found[1], kind == "counter" ? family + "_total" : family) << lines[i];
-      EXPECT_TRUE(samples.insert(found[1].str() + found[2].str()).second) << "twice: " << lines[i];
-      values[found[1]] = found[3];
+  constexpr int kNames = 1500;
+  test::PlainClient hostile(socket());
+  ASSERT_TRUE(hostile.shakeHands());
+  for (int i = 0; i < kNames; ++i)
+    hostile.call(
+        "SendMessageWithSessionInfo", "a{sv}aa{sv}qqaa{sv}",
+        [&](MessageWriter& out) {
+          out.writeDictionary({{kKYTReportingSessionInfoSessionID, 77},
+                               {kKYTReportingSessionInfoClientType, 7},
+                               {kKYTReportingSessionInfoRequireUserInfo, true}});
+          out.writeOptionalDictionary(
+              Dictionary{{"ClientName", std::to_string(i) + std::string(5000, 'n')}, {"ServiceName", "s"}});
+          out.writeUInt16(5);
+          out.writeUInt16(1);
+          out.writeOptionalDictionary(std::nullopt);
+        },
+        i == kNames - 1);
+  ASSERT_TRUE(hostile.receive());
+  const bool isRoot = ::geteuid() == 0;
+  if (isRoot) reportAsNobody();
+
+  const std::vector<Dictionary> books = rows(json({"books"}), "rows");
+  int64_t taken = 0, merged = 0;
+  size_t own = 0, others = 0;
+  for (const Dictionary& row : books) {
+    EXPECT_LE(text(row, "client").size(), Limits::maxBookNameBytes);
+    if (row.unsignedInteger("user") != ::geteuid()) {
+      ++others;
+      EXPECT_EQ(text(row, "client"), "a");
+      continue;
     }
+    ++own;
+    taken += row.integer("taken");
+    merged += row.integer("programsMerged");
   }
-  EXPECT_EQ(values["kytreportingd_sessions"], "1");
-  EXPECT_TRUE(values.count("kytreportingd_events_dropped_total")) << run.text;
-  EXPECT_NE(run.text.find(R"(client="a \"quoted\" \\ name\\n")"), std::string::npos) << run.text;
+  EXPECT_EQ(own, Limits::maxBookRowsOfUser + 1) << "and the one that the others share";
+  EXPECT_EQ(merged, kNames - static_cast<int64_t>(Limits::maxBookRowsOfUser));
+  EXPECT_EQ(taken, kNames);
+  EXPECT_TRUE(others > 0 || !isRoot);
+  static_cast<void>(columns({"books"}));
 }
 
 TEST_F(KytctlWindow, SaysThatTheDaemonDoesNotRunAndWhetherASocketWaits) {

@@ -80,6 +80,11 @@ struct WatchOptions {
   bool json = false;
 };
 
+struct MetricsOptions {
+  bool textFormat = false;  // the older one, without units and without an end
+  bool json = false;
+};
+
 struct SimulateOptions {
   std::string bag, events;  // files
   uint32_t devices = 1000;
@@ -138,7 +143,7 @@ struct SimulateOptions {
 [[nodiscard]] int sessionsCommand(const std::string& root, bool json);
 [[nodiscard]] int booksCommand(const std::string& root, bool json);
 [[nodiscard]] int storebagsCommand(const std::string& root, bool json);
-[[nodiscard]] int metricsCommand(const std::string& root, bool json);
+[[nodiscard]] int metricsCommand(const std::string& root, const MetricsOptions& options);
 // Prints the level, or sets it first.
 [[nodiscard]] int logLevelCommand(const std::string& root, const std::string& level, bool json);
 // Prints events as they pass, until the daemon ends or this program is interrupted.
@@ -148,5 +153,7 @@ struct SimulateOptions {
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);
 int failed(const std::string& text);
+// The same, of a question to the running daemon; returns 3 where it does not run.
+int failedAtWindow(const Error& error);
 
 }  // namespace kyt::tools

@@ -19,13 +19,7 @@ namespace kyt::tools {
 
 namespace {
 
-constexpr int kNotRunning = 3;
 constexpr size_t kFateAt = 58;  // characters before the fate
-
-int refused(const Error& error) {
-  failed(error);
-  return error.code == WindowClient::kNoDaemon ? kNotRunning : 1;
-}
 
 std::optional<uint32_t> userOf(const std::string& text) {
   uint32_t number = 0;
@@ -116,16 +110,16 @@ int watchCommand(const std::string& root, const WatchOptions& options) {
   if (options.category) filter.set("category", *options.category);
   if (options.bodies) filter.set("bodies", true);
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto& window = std::get<WindowClient>(client);
-  if (const auto error = window.watch(filter)) return refused(*error);
+  if (const auto error = window.watch(filter)) return failedAtWindow(*error);
   if (!options.json) {
     std::fputs(line("TIME", "USER", "CLIENT:SERVICE", "BACK END", "EVENT", "FATE").c_str(), stdout);
     std::fflush(stdout);
   }
   for (;;) {
     auto passed = window.nextPassed();
-    if (const auto* error = std::get_if<Error>(&passed)) return refused(*error);
+    if (const auto* error = std::get_if<Error>(&passed)) return failedAtWindow(*error);
     print(std::get<Dictionary>(passed), options.json);
   }
 }

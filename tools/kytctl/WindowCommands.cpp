@@ -1,4 +1,4 @@
-// kytctl status, sessions, books, storebags, metrics, log-level: what the daemon says at its administration socket, for
+// kytctl status, sessions, books, storebags, log-level, reload: what the daemon says at its administration socket, for
 // people in columns, for programs as one JSON object.
 #include <algorithm>
 #include <cstdio>
@@ -16,13 +16,6 @@
 namespace kyt::tools {
 
 namespace {
-
-constexpr int kNotRunning = 3;
-
-int refused(const Error& error) {
-  failed(error);
-  return error.code == WindowClient::kNoDaemon ? kNotRunning : 1;
-}
 
 void printJSON(const Value& value) {
   std::string text;
@@ -72,14 +65,20 @@ std::string droppedText(const Dictionary& row) {
 
 }  // namespace
 
+int failedAtWindow(const Error& error) {
+  failed(error);
+  constexpr int kNotRunning = 3;
+  return error.code == WindowClient::kNoDaemon ? kNotRunning : 1;
+}
+
 int statusCommand(const std::string& root, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto& window = std::get<WindowClient>(client);
   auto status = window.dictionary("Status");
-  if (const auto* error = std::get_if<Error>(&status)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&status)) return failedAtWindow(*error);
   auto bags = window.dictionaries("Storebags");
-  if (const auto* error = std::get_if<Error>(&bags)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&bags)) return failedAtWindow(*error);
   Dictionary& told = std::get<Dictionary>(status);
   auto& storebags = std::get<std::vector<Dictionary>>(bags);
   if (!json) {
@@ -95,12 +94,12 @@ int statusCommand(const std::string& root, bool json) {
 
 int sessionsCommand(const std::string& root, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto& window = std::get<WindowClient>(client);
   auto status = window.dictionary("Status");
-  if (const auto* error = std::get_if<Error>(&status)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&status)) return failedAtWindow(*error);
   auto answer = window.dictionaries("Sessions");
-  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   auto& sessions = std::get<std::vector<Dictionary>>(answer);
   const Dictionary& told = std::get<Dictionary>(status);
   const int64_t all = numberIn(told, "sessions");
@@ -127,9 +126,9 @@ int sessionsCommand(const std::string& root, bool json) {
 
 int booksCommand(const std::string& root, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto answer = std::get<WindowClient>(client).dictionaries("Books");
-  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   auto& rows = std::get<std::vector<Dictionary>>(answer);
   if (json) {
     printJSON(listed("rows", std::move(rows)));
@@ -159,12 +158,12 @@ int booksCommand(const std::string& root, bool json) {
 
 int storebagsCommand(const std::string& root, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto& window = std::get<WindowClient>(client);
   auto status = window.dictionary("Status");
-  if (const auto* error = std::get_if<Error>(&status)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&status)) return failedAtWindow(*error);
   auto answer = window.dictionaries("Storebags");
-  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   auto& bags = std::get<std::vector<Dictionary>>(answer);
   if (json) {
     printJSON(listed("storebags", std::move(bags)));
@@ -184,27 +183,14 @@ int storebagsCommand(const std::string& root, bool json) {
   return 0;
 }
 
-int metricsCommand(const std::string& root, bool json) {
-  auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
-  auto answer = std::get<WindowClient>(client).text("Metrics");
-  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
-  const auto& text = std::get<std::string>(answer);
-  if (json)
-    printJSON(Dictionary{{"openmetrics", text}});
-  else
-    std::fputs(text.c_str(), stdout);
-  return 0;
-}
-
 int logLevelCommand(const std::string& root, const std::string& level, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto& window = std::get<WindowClient>(client);
   if (!level.empty())
-    if (const auto error = window.tell("SetLogLevel", level)) return refused(*error);
+    if (const auto error = window.tell("SetLogLevel", level)) return failedAtWindow(*error);
   auto status = window.dictionary("Status");
-  if (const auto* error = std::get_if<Error>(&status)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&status)) return failedAtWindow(*error);
   const std::string now = textIn(std::get<Dictionary>(status), "logLevel");
   if (json)
     printJSON(Dictionary{{"logLevel", now}});
@@ -215,9 +201,9 @@ int logLevelCommand(const std::string& root, const std::string& level, bool json
 
 int reloadCommand(const std::string& root, bool json) {
   auto client = WindowClient::connect(root);
-  if (const auto* error = std::get_if<Error>(&client)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&client)) return failedAtWindow(*error);
   auto answer = std::get<WindowClient>(client).texts("Reload");
-  if (const auto* error = std::get_if<Error>(&answer)) return refused(*error);
+  if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   Array lines;
   for (const std::string& line : std::get<std::vector<std::string>>(answer)) {
     if (!json) std::printf("%s\n", escapedText(line).c_str());

@@ -29,6 +29,7 @@ struct Arguments {
   ProbeOptions probe;
   RingOptions ring;
   WatchOptions watch;
+  MetricsOptions metrics;
   std::string script, domain, key, value, type = "string", folder, document, publicKey, oldBag, newBag;
   unsigned bits = 2048;
   std::string level;
@@ -267,13 +268,18 @@ void addWindow(const Command& program, Arguments& a) {
        sessionsCommand},
       {"books", "Print what became of each program's events", booksCommand},
       {"storebags", "Print which storebags are in force", storebagsCommand},
-      {"metrics", "Print the figures in the OpenMetrics text format", metricsCommand},
       {"reload", "Let the running daemon take up changed settings", reloadCommand}};
   for (const auto& [name, what, run] : commands) {
     const Command command = program.command(name, what);
     command.flag("--json", a.json, "Print one JSON object");
     command.runs([&a, run = run] { a.status = run(a.connection.root, a.json); });
   }
+  const Command metrics =
+      program.command("metrics", "Print the figures in the OpenMetrics text format, or an older one");
+  const CommandOption json = metrics.flag("--json", a.metrics.json, "Print one JSON object");
+  metrics.flag("--text-format", a.metrics.textFormat, "In the older text format, without units and end")
+      .excludes(json);
+  metrics.runs([&a] { a.status = metricsCommand(a.connection.root, a.metrics); });
   const Command watch = program.command("watch", "Print events as they pass, with their fate");
   watch.option("--user", a.watch.user, "Of this user's programs alone, by name or number");
   watch.option("--client", a.watch.client, "Of clients of this name alone");

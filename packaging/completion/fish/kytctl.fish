@@ -77,6 +77,7 @@ complete -c kytctl -n __kytctl_at -a sessions -d 'The sessions of the running da
 complete -c kytctl -n __kytctl_at -a books -d 'What became of events'
 complete -c kytctl -n __kytctl_at -a storebags -d 'Which storebags are in force'
 complete -c kytctl -n __kytctl_at -a metrics -d 'Figures in the OpenMetrics text format'
+complete -c kytctl -n '__kytctl_at -b metrics' -l text-format -d 'In the older text format'
 complete -c kytctl -n __kytctl_at -a log-level -d 'What the running daemon logs'
 complete -c kytctl -n __kytctl_at -a reload -d 'Let the running daemon take up settings'
 complete -c kytctl -n __kytctl_at -a ring -d 'In which of 100 rings this device is'
