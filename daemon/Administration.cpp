@@ -33,6 +33,9 @@ class Administration::Window final : public AdministrationInterface {
   [[nodiscard]] std::vector<Dictionary> sessions() override { return all_.sessions(); }
   [[nodiscard]] std::vector<Dictionary> books() override { return all_.books(); }
   [[nodiscard]] std::vector<Dictionary> storebags() override { return all_.storebags(); }
+  [[nodiscard]] std::optional<Dictionary> storebag(std::string_view name) override {
+    return all_.storebag(name);
+  }
   [[nodiscard]] std::string metrics() override { return all_.metrics(); }
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) override {
     return all_.setLogLevel(level);

@@ -69,6 +69,8 @@ class Administration final : public ListenerDelegate {
   [[nodiscard]] std::vector<Dictionary> sessions() const;
   [[nodiscard]] std::vector<Dictionary> books() const;
   [[nodiscard]] std::vector<Dictionary> storebags() const;
+  // None where no storebag of that name is in force.
+  [[nodiscard]] std::optional<Dictionary> storebag(std::string_view name) const;
   [[nodiscard]] std::string metrics() const;
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
   // Begins to watch; null where the limit of watchers is reached.

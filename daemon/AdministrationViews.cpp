@@ -174,6 +174,13 @@ const char* storebagStateName(StorebagView::State state) {
   return "failed";
 }
 
+Dictionary shown(const StorebagView& view) {
+  return {{"name", view.name},           {"version", view.version},
+          {"address", view.address},     {"fetched", view.fetched},
+          {"expires", view.expires},     {"state", storebagStateName(view.state)},
+          {"lastError", view.lastError}, {"lastErrorAt", view.lastErrorAt}};
+}
+
 }  // namespace
 
 Dictionary Administration::status() const {
@@ -223,16 +230,16 @@ std::vector<Dictionary> Administration::books() const {
 
 std::vector<Dictionary> Administration::storebags() const {
   std::vector<Dictionary> views;
-  for (const StorebagView& view : sources_.storebags.views())
-    views.push_back(Dictionary{{"name", view.name},
-                               {"version", view.version},
-                               {"address", view.address},
-                               {"fetched", view.fetched},
-                               {"expires", view.expires},
-                               {"state", storebagStateName(view.state)},
-                               {"lastError", view.lastError},
-                               {"lastErrorAt", view.lastErrorAt}});
+  for (const StorebagView& view : sources_.storebags.views()) views.push_back(shown(view));
   return views;
+}
+
+std::optional<Dictionary> Administration::storebag(std::string_view name) const {
+  const std::optional<StorebagView> view = sources_.storebags.view(std::string(name));
+  if (!view || view->version.empty()) return std::nullopt;
+  Dictionary bag = shown(*view);
+  bag.set("section", view->section);
+  return bag;
 }
 
 }  // namespace kyt

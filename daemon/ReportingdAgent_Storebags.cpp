@@ -108,6 +108,7 @@ std::optional<Dictionary> ReportingdAgent::fetchAndCacheStorebag(int32_t clientT
   if (fetch.lastModified) entry.set(kLastModified, std::move(*fetch.lastModified));
   const auto now = static_cast<int64_t>(configuration_.platform.clock.timeOfDay().asSeconds());
   const std::optional<String> version = stringEntry(entry, kVersion);
+  std::optional<Dictionary> section = sectionOf(entry);
   storebags_.publish({.name = name->str(),
                       .version = version ? version->str() : std::string(),
                       .address = std::move(fetch.address),
@@ -117,8 +118,8 @@ std::optional<Dictionary> ReportingdAgent::fetchAndCacheStorebag(int32_t clientT
                                : fetch.problem.empty() ? StorebagView::State::good
                                                        : StorebagView::State::fallback,
                       .lastError = fetch.problem,
-                      .lastErrorAt = fetch.problem.empty() ? 0 : now});
-  std::optional<Dictionary> section = sectionOf(entry);
+                      .lastErrorAt = fetch.problem.empty() ? 0 : now,
+                      .section = section.value_or(Dictionary())});
   _cachedStorebags.set(*name, std::move(entry));
   cachedStorebagsSize_.reset();
   return section;

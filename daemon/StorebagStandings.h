@@ -4,10 +4,12 @@
 
 #include <cstdint>
 #include <map>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "platform/base/Mutex.h"
+#include "platform/objects/Value.h"
 
 namespace kyt {
 
@@ -25,6 +27,7 @@ struct StorebagView {
   State state = State::good;
   std::string lastError;  // empty: none yet
   int64_t lastErrorAt = 0;
+  Dictionary section;  // in force, of the environment in force
 };
 
 class StorebagStandings {
@@ -38,6 +41,12 @@ class StorebagStandings {
       view.lastErrorAt = known.lastErrorAt;
     }
     known = std::move(view);
+  }
+  // None of that name was asked for: none.
+  [[nodiscard]] std::optional<StorebagView> view(const std::string& name) const EXCLUDES(mutex_) {
+    MutexLock lock(mutex_);
+    const auto known = views_.find(name);
+    return known != views_.end() ? std::optional(known->second) : std::nullopt;
   }
   // By name.
   [[nodiscard]] std::vector<StorebagView> views() const EXCLUDES(mutex_) {

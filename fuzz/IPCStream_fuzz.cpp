@@ -61,6 +61,9 @@ class EmptyWindow final : public AdministrationInterface {
   std::vector<Dictionary> sessions() override { return {{{"user", 1}}, {}}; }
   std::vector<Dictionary> books() override { return {}; }
   std::vector<Dictionary> storebags() override { return {}; }
+  std::optional<Dictionary> storebag(std::string_view name) override {
+    return name.empty() ? std::nullopt : std::optional(Dictionary{{"name", name}});
+  }
   std::string metrics() override { return "# EOF\n"; }
   std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
   std::optional<std::string> reload(std::vector<std::string>& /*lines*/) override { return std::nullopt; }

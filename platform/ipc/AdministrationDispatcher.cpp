@@ -97,6 +97,16 @@ void watch(const Call& call, std::string_view /*signature*/) {
     call.reply.answerNothing();
 }
 
+void storebag(const Call& call, std::string_view signature) {
+  std::string_view name;
+  call.in.readStringView(name);
+  if (call.in.finish() != BodyStatus::ok) return;
+  if (const auto answer = call.window.storebag(name))
+    call.reply.answer(signature, [&](MessageWriter& out) { out.writeDictionary(*answer); });
+  else
+    call.reply.error(wire::kErrorFailed, "no storebag of that name is in force");
+}
+
 // Each at the place of its row in kAdministrationMethods.
 constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     status,
@@ -107,6 +117,7 @@ constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     setLogLevel,
     reload,
     watch,
+    storebag,
 };
 
 size_t numberOf(std::string_view member) {

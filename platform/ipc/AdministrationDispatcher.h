@@ -21,10 +21,11 @@ struct AdministrationContract {
   std::string_view member, signature, reply;
 };
 inline constexpr std::array kAdministrationMethods{
-    AdministrationContract{"Status", "", "a{sv}"}, AdministrationContract{"Sessions", "", "aa{sv}"},
-    AdministrationContract{"Books", "", "aa{sv}"}, AdministrationContract{"Storebags", "", "aa{sv}"},
-    AdministrationContract{"Metrics", "", "s"},    AdministrationContract{"SetLogLevel", "s", ""},
-    AdministrationContract{"Reload", "", "as"},    AdministrationContract{"Watch", "a{sv}", ""},
+    AdministrationContract{"Status", "", "a{sv}"},    AdministrationContract{"Sessions", "", "aa{sv}"},
+    AdministrationContract{"Books", "", "aa{sv}"},    AdministrationContract{"Storebags", "", "aa{sv}"},
+    AdministrationContract{"Metrics", "", "s"},       AdministrationContract{"SetLogLevel", "s", ""},
+    AdministrationContract{"Reload", "", "as"},       AdministrationContract{"Watch", "a{sv}", ""},
+    AdministrationContract{"Storebag", "s", "a{sv}"},
 };
 inline constexpr std::string_view kPassedSignal = "Passed", kPassedSignature = "a{sv}";
 

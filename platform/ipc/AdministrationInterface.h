@@ -36,6 +36,8 @@ class AdministrationInterface : public ExportedObject {
   [[nodiscard]] virtual std::vector<Dictionary> sessions() = 0;
   [[nodiscard]] virtual std::vector<Dictionary> books() = 0;
   [[nodiscard]] virtual std::vector<Dictionary> storebags() = 0;
+  // None where no storebag of that name is in force.
+  [[nodiscard]] virtual std::optional<Dictionary> storebag(std::string_view name) = 0;
   [[nodiscard]] virtual std::string metrics() = 0;
   // "debug", "default" or "error", until the daemon ends. What is wrong with it, or none.
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;

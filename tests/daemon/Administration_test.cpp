@@ -166,10 +166,23 @@ TEST_F(AdministrationTest, ShowsWhyAStorebagIsNotThere) {
   const std::vector<Dictionary> bags = administration_.storebags();
   ASSERT_EQ(bags.size(), 1U);
   EXPECT_EQ(*bags[0].string("state"), "failed");
+  EXPECT_EQ(administration_.storebag(bags[0].string("name")->view()), std::nullopt) << "none is in force";
   EXPECT_EQ(*bags[0].string("version"), "");
   EXPECT_EQ(*bags[0].string("lastError"), "no such host");
   EXPECT_NE(bags[0].integer("lastErrorAt"), 0);
   EXPECT_EQ(bags[0].integer("expires") - bags[0].integer("fetched"), kStorebagRetrySeconds);
+}
+
+TEST_F(AdministrationTest, GivesTheStorebagThatIsInForceByItsName) {
+  EXPECT_EQ(administration_.storebag("cadmor"), std::nullopt);
+  Client client = clientWith(sessionInfo());
+  ASSERT_TRUE(configure(client));
+  const std::optional<Dictionary> bag = administration_.storebag("cadmor");
+  ASSERT_NE(bag, std::nullopt);
+  EXPECT_EQ(*bag->string("version"), "1.0");
+  EXPECT_EQ(*bag->string("state"), "good");
+  EXPECT_NE(bag->dictionary("section")->find("httppost"), nullptr);
+  EXPECT_EQ(administration_.storebag("dulvek"), std::nullopt);
 }
 
 TEST_F(AdministrationTest, AddsUpTheBooksOfAllPrograms) {

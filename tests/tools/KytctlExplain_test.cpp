@@ -2,6 +2,7 @@
 // daemon then does the same.
 #include <filesystem>
 
+#include "platform/linux/base/UnixSocket.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "tests/integration/StageFixture.h"
 
@@ -264,6 +265,63 @@ TEST_F(KytctlExplain, LooksForTheProgramsEntitlement) {
   std::filesystem::remove(stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml");
   expectLost(report(), "unentitled-connection");
   EXPECT_EQ(run({"--user", "nobody-of-that-name"}).status, 2);
+}
+
+TEST_F(KytctlExplain, TakesTheBagThatTheRunningDaemonHas) {
+  prepare();
+  startDaemon();
+  const auto from = [](const Dictionary& told) {
+    return description(*told.dictionary("storebag")->find("from"));
+  };
+  EXPECT_TRUE(from(report()).starts_with("https://")) << "the daemon has fetched none yet";
+  {
+    TestClient client(socket(), 20, "person");
+    ASSERT_EQ(client.configure(), "live: httppost");
+  }
+  // What the server has now, the daemon does not know.
+  Dictionary changed = entry("person");
+  changed.set("event_blacklist", Array{3});
+  putBag("cadmor", {changed});
+  const Dictionary told = report();
+  EXPECT_EQ(status_, 0);
+  EXPECT_TRUE(from(told).starts_with("the running daemon, which asked https://")) << from(told);
+  EXPECT_EQ(description(*told.dictionary("storebag")->find("signature")), "checked by the daemon");
+  EXPECT_EQ(description(*told.dictionary("storebag")->find("version")), "1");
+  const Dictionary fetched = report({"--fetch"});
+  expectLost(fetched, "event-filtered");
+  EXPECT_TRUE(from(fetched).starts_with("https://")) << from(fetched);
+  EXPECT_EQ(stage_->stopDaemon(std::chrono::seconds(30)).value_or(-1), 0);
+  expectLost(report(), "event-filtered");
+  EXPECT_NE(run({"--fetch", "--storebag", "x"}).status, 0);
+}
+
+TEST_F(KytctlExplain, AsksTheServerWhereTheDaemonWillDoSoForTheNextSession) {
+  tools::Stage::Options options;
+  options.serverArguments = {"--max-age", "1"};
+  prepare({}, std::move(options));
+  startDaemon();
+  {
+    TestClient client(socket(), 20, "person");
+    ASSERT_EQ(client.configure(), "live: httppost");
+  }
+  EXPECT_TRUE(eventually(
+      [&] { return description(*report().dictionary("storebag")->find("from")).starts_with("https://"); }));
+}
+
+TEST_F(KytctlExplain, LooksForTheEntitlementOfAProgramFile) {
+  if (!kernelTellsPeerProcess()) GTEST_SKIP() << "this kernel does not tell which process is connected";
+  prepare();
+  const std::string client = stage_->program("kytctl");
+  ASSERT_FALSE(tools::writeFile(
+      stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml",
+      "[[grant]]\nexecutable = \"" + client + "\"\n\"com.vantu.private.kytreportingd\" = true\n", 0644));
+  EXPECT_EQ(run().status, 2) << "it depends on the program";
+  const ProgramRun granted = run({"--program", client});
+  EXPECT_EQ(granted.status, 0) << granted.text;
+  expectLost(report({"--program", "/bin/true"}), "unentitled-connection");
+  EXPECT_EQ(run({"--program", "/no/such/program"}).status, 2);
+  EXPECT_EQ(run({"--program", "/bin"}).status, 2);
+  EXPECT_NE(run({"--program", client, "--pid", "1"}).status, 0);
 }
 
 }  // namespace

@@ -248,7 +248,7 @@ Explanation explain(const RehearsedDevice& device, const ExplainStorebag& storeb
       {"session", sessionIn(course, facts)},
       {"storebag",
        Dictionary{{"from", storebag.from},
-                  {"signature", facts.storebagVerified ? "required" : "not checked"},
+                  {"signature", facts.storebagSignature},
                   {"version", course.session.hasStorebag ? Value(course.session.storebagVersion) : Value()}}},
       {"rules", rulesIn(course)},
       {"sampling", Dictionary{{"leavesAt", leavesAt}, {"drawsTried", tried}}},

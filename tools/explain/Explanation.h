@@ -25,8 +25,8 @@ struct ExplainFacts {
   // Of the program: 0 granted, 1 refused, 2 cannot be told; and what was looked at.
   int entitlement = 0;
   std::vector<std::string> entitlementLines;
-  bool storebagVerified = true;         // otherwise it had no signature to check
-  std::vector<std::string> unreadable;  // "FILE: REASON"
+  std::string storebagSignature = "required";  // or who else looked at it, or that nobody did
+  std::vector<std::string> unreadable;         // "FILE: REASON"
 };
 
 struct Explanation {

@@ -53,8 +53,9 @@ struct RingOptions {
 };
 
 struct CheckOptions {
-  int32_t pid = 0;   // of a client, or
-  std::string user;  // a name or a number: any client of that user
+  int32_t pid = 0;      // of a client, or
+  std::string user;     // a name or a number: any client of that user,
+  std::string program;  // which runs this program file; empty: any
 };
 
 struct ExplainOptions {
@@ -66,8 +67,9 @@ struct ExplainOptions {
   std::string userInfoJSON;     // instead of the two
   std::string sessionInfoJSON;  // instead of the four before
   bool requireUserInfo = false, batch = false, single = false;
-  std::string storebag;  // a file; empty: the server's
-  CheckOptions program;  // neither: any process of the user who asks
+  std::string storebag;  // a file; empty: the running daemon's, or the server's
+  bool fetch = false;    // the server's, also where a daemon has one
+  CheckOptions program;  // neither process nor user: any process of the user who asks
   double draw = -1;      // below 0: all are tried
   bool json = false;
 };

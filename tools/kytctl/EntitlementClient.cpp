@@ -3,6 +3,7 @@
 #include <grp.h>
 #include <poll.h>
 #include <pwd.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -95,6 +96,22 @@ std::variant<EntitlementClient, std::string> EntitlementClient::ofUser(const std
   if (::getgrouplist(entry->pw_name, entry->pw_gid, groups.data(), &count) >= 0)
     client.peer.groups.assign(groups.begin(), groups.begin() + count);
   return client;
+}
+
+// What stands for the process is this one, which lives until all is told.
+std::variant<EntitlementClient, std::string> EntitlementClient::ofProgram(const std::string& path,
+                                                                          const std::string& user) {
+  auto found = ofUser(user);
+  auto* client = std::get_if<EntitlementClient>(&found);
+  if (client == nullptr) return found;
+  struct stat status = {};
+  if (::stat(path.c_str(), &status) != 0) return path + ": " + errorText(errno);
+  if (!S_ISREG(status.st_mode)) return path + " is no program file";
+  client->file = ProgramIdentity{status.st_dev, status.st_ino};
+  client->program = path;
+  client->peer.pid = ::getpid();
+  if (kernelTellsPeerProcess()) client->peer.pidfd = openProcess(client->peer.pid);
+  return found;
 }
 
 bool EntitlementClient::hasEnded() const {

@@ -55,6 +55,7 @@ void sayClient(Lines& out, const EntitlementClient& client) {
   if (client.isProcess)
     out.say("process %d runs %s", client.peer.pid,
             client.program.empty() ? "a program that may not be looked at" : client.program.c_str());
+  if (client.file) out.say("any process that runs %s", client.program.c_str());
   out.say("user %s, groups %s", userText(client.peer.uid).c_str(), client.groupsText().c_str());
   if (!client.peer.securityLabel.empty()) out.say("security label %s", client.peer.securityLabel.c_str());
 }
@@ -90,10 +91,13 @@ class AsDaemon {
   bool changed_ = false;
 };
 
-// The daemon asks a helper that may look at every process; here that is root, when this is run by root.
+// The daemon asks a helper that may look at every process; here that is root, when this is run by root. Where a program file
+// was named, every process runs that.
 class OwnInspector final : public ProgramInspector {
  public:
+  explicit OwnInspector(std::optional<ProgramIdentity> file) : file_(file) {}
   std::variant<ProgramIdentity, int> runningProgram(int32_t pid) override {
+    if (file_) return *file_;
     const uid_t user = ::geteuid();
     const bool root = ::getuid() == 0 && user != 0 && ::seteuid(0) == 0;
     auto program = direct_.runningProgram(pid);
@@ -103,6 +107,7 @@ class OwnInspector final : public ProgramInspector {
   std::string programPath(int32_t pid) override { return direct_.programPath(pid); }
 
  private:
+  const std::optional<ProgramIdentity> file_;
   DirectProgramInspector direct_;
 };
 
@@ -182,7 +187,8 @@ class Check {
   void executable(const std::string& wanted) {
     using Program = EntitlementMatch::Program;
     const std::string criterion = "executable \"" + wanted + "\"";
-    if (!client_.isProcess) return tell(criterion, Answer::unknown, "it depends on the process");
+    if (!client_.isProcess && !client_.file)
+      return tell(criterion, Answer::unknown, "it depends on the process");
     const auto result = match_.runs(wanted);
     switch (result.program) {
       case Program::matches:
@@ -306,8 +312,9 @@ int verdict(Lines& out, bool granted, bool mayBeGranted, const EntitlementClient
 
 int checkEntitlement(const std::string& root, const CheckOptions& options, std::vector<std::string>& lines) {
   Lines out(lines);
-  auto found =
-      options.pid != 0 ? EntitlementClient::ofProcess(options.pid) : EntitlementClient::ofUser(options.user);
+  auto found = options.pid != 0          ? EntitlementClient::ofProcess(options.pid)
+               : options.program.empty() ? EntitlementClient::ofUser(options.user)
+                                         : EntitlementClient::ofProgram(options.program, options.user);
   if (const auto* wrong = std::get_if<std::string>(&found)) return out.cannotTell(*wrong);
   const EntitlementClient& client = std::get<EntitlementClient>(found);
   sayClient(out, client);
@@ -315,7 +322,7 @@ int checkEntitlement(const std::string& root, const CheckOptions& options, std::
   const auto daemon = daemonUser(root);
   TomlEntitlementsOptions files{root + "/etc/kytreportingd/entitlements.d", std::nullopt};
   if (!root.empty()) files.trustedUser = daemon ? daemon->user : ::geteuid();
-  OwnInspector inspector;
+  OwnInspector inspector(client.file);
   bool granted = false;
   Outcome outcome;
   {

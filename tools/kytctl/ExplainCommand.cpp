@@ -6,6 +6,7 @@
 #include <utility>
 #include <variant>
 
+#include "config/ClientTypes.h"
 #include "platform/objects/Keys.h"
 #include "tools/StorebagFile.h"
 #include "tools/explain/Explanation.h"
@@ -61,9 +62,15 @@ std::variant<RehearsedProgram, std::string> programOf(const ExplainOptions& opti
   return program;
 }
 
-std::variant<std::unique_ptr<StorebagSource>, Error> storebagOf(const ExplainOptions& options,
+std::variant<std::unique_ptr<StorebagSource>, Error> storebagOf(const std::string& root,
+                                                                const ExplainOptions& options,
+                                                                const RehearsedProgram& program,
                                                                 DevicePorts& ports) {
   if (!options.storebag.empty()) return StorebagSource::file(options.storebag, ports);
+  const auto name =
+      storebagNameForClientType(program.sessionInfo.integer(kKYTReportingSessionInfoClientType));
+  if (name && !options.fetch)
+    if (auto source = StorebagSource::daemon(root, name->str(), ports)) return source;
   return StorebagSource::server(ports);
 }
 
@@ -89,10 +96,10 @@ int explainCommand(const std::string& root, const ExplainOptions& options) {
   if (whom.user.empty() && whom.pid == 0) whom.user = std::to_string(::getuid());
   facts.entitlement = checkEntitlement(root, whom, facts.entitlementLines);
 
-  auto made = storebagOf(options, ports);
+  auto made = storebagOf(root, options, facts.program, ports);
   if (auto* error = std::get_if<Error>(&made)) return cannotTell(error->localizedDescription);
   StorebagSource& source = *std::get<std::unique_ptr<StorebagSource>>(made);
-  facts.storebagVerified = source.isSigned();
+  facts.storebagSignature = source.signature();
   facts.unreadable = ports.unreadable();
   const Explanation explanation =
       explain(ports.device(source.isSigned()),

@@ -160,9 +160,10 @@ void sayWhatItIsAbout(Page& page, const Dictionary& report) {
   page.row("user info",
            textIn(session, "userInformation").empty() ? "none" : textIn(session, "userInformation"));
   const Dictionary& bag = partOf(report, "storebag");
-  page.row("storebag", (textIn(bag, "version").empty() ? "" : "version " + textIn(bag, "version") + ", ") +
-                           (textIn(bag, "from").empty() ? "not asked for" : "from " + textIn(bag, "from")) +
-                           (textIn(bag, "signature") == "required" ? "" : ", signature not checked"));
+  page.row("storebag",
+           (textIn(bag, "version").empty() ? "" : "version " + textIn(bag, "version") + ", ") +
+               (textIn(bag, "from").empty() ? "not asked for" : "from " + textIn(bag, "from")) +
+               (textIn(bag, "signature") == "required" ? "" : ", signature " + textIn(bag, "signature")));
   if (!session.boolean("singleMessage"))
     page.row("back ends", listIn(session, "backends").empty()
                               ? "none"

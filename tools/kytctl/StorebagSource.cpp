@@ -1,11 +1,16 @@
 #include "tools/kytctl/StorebagSource.h"
 
+#include <cstdint>
+#include <ctime>
 #include <utility>
 
+#include "config/Environment.h"
 #include "platform/linux/url/CurlURLSession.h"
 #include "platform/objects/Keys.h"
 #include "tools/StorebagFile.h"
 #include "tools/explain/UnsignedBag.h"
+#include "tools/kytctl/StatusText.h"
+#include "tools/kytctl/WindowClient.h"
 
 namespace kyt::tools {
 
@@ -57,10 +62,33 @@ std::variant<std::unique_ptr<StorebagSource>, Error> StorebagSource::file(const 
     auto bag = reader.read(reply.body, dot == std::string::npos ? "" : path.substr(dot + 1));
     if (const auto* error = std::get_if<Error>(&bag))
       return Error{error->domain, error->code, path + ": " + error->localizedDescription};
-    source->signed_ = false;
+    source->signature_ = "not checked";
     reply.body = unsignedDocument(std::get<Dictionary>(bag), ports.propertyLists());
   }
   source->reply_ = std::move(reply);
+  return source;
+}
+
+// The daemon keeps the section of the environment that was in force when it fetched: whichever is in force now, a session has
+// that one.
+std::unique_ptr<StorebagSource> StorebagSource::daemon(const std::string& root, const std::string& name,
+                                                       DevicePorts& ports) {
+  auto window = WindowClient::connect(root);
+  if (std::holds_alternative<Error>(window)) return nullptr;
+  auto answer = std::get<WindowClient>(window).dictionary("Storebag", name);
+  const auto* known = std::get_if<Dictionary>(&answer);
+  const Dictionary* section = known != nullptr ? known->dictionary("section") : nullptr;
+  if (section == nullptr || numberIn(*known, "expires") <= static_cast<int64_t>(std::time(nullptr)))
+    return nullptr;
+  Dictionary bag{{"version", textIn(*known, "version")}};
+  for (uint32_t environment = 0; environment <= kEnvironmentRelease; ++environment)
+    if (const auto key = environmentName(environment)) bag.set(*key, *section);
+  std::unique_ptr<StorebagSource> source(new StorebagSource);
+  const std::string state = textIn(*known, "state"), error = textIn(*known, "lastError");
+  source->from_ = "the running daemon, which asked " + textIn(*known, "address");
+  if (state != "good") source->from_ += " (" + state + ": " + error + ")";
+  source->signature_ = "checked by the daemon";
+  source->reply_.emplace().body = unsignedDocument(bag, ports.propertyLists());
   return source;
 }
 

@@ -22,6 +22,10 @@ class StorebagSource {
   // A document as servers hand it out, or a bag that nobody has signed yet (.json, .toml or .plist).
   [[nodiscard]] static std::variant<std::unique_ptr<StorebagSource>, Error> file(const std::string& path,
                                                                                  DevicePorts& ports);
+  // What the running daemon has in force for that name and will not fetch anew for the next session. Null: there is none, no
+  // daemon runs beneath the root, or whoever asks may not look at it.
+  [[nodiscard]] static std::unique_ptr<StorebagSource> daemon(const std::string& root,
+                                                              const std::string& name, DevicePorts& ports);
   // The device's, with its authorities; asked once.
   [[nodiscard]] static std::unique_ptr<StorebagSource> server(DevicePorts& ports);
   ~StorebagSource();
@@ -30,7 +34,10 @@ class StorebagSource {
   [[nodiscard]] Rehearsal::StorebagServer answers();
   // A file, or the address once it was asked.
   [[nodiscard]] const std::string& from() const { return from_; }
-  [[nodiscard]] bool isSigned() const { return signed_; }
+  // Whether the rehearsal checks the signature.
+  [[nodiscard]] bool isSigned() const { return signature_ == kRequired; }
+  // "required", "not checked", "checked by the daemon".
+  [[nodiscard]] const std::string& signature() const { return signature_; }
   // Why the server gave no answer at all; empty as long as it did.
   [[nodiscard]] const std::string& problem() const { return problem_; }
 
@@ -42,7 +49,8 @@ class StorebagSource {
   std::unique_ptr<Network> network_;  // none: a file
   std::optional<FakeURLSessionFactory::Reply> reply_;
   std::string from_, problem_;
-  bool signed_ = true;
+  static constexpr char kRequired[] = "required";
+  std::string signature_ = kRequired;
 };
 
 }  // namespace kyt::tools

@@ -155,8 +155,9 @@ std::variant<Message, Error> WindowClient::answerTo(const std::string& question)
   }
 }
 
-std::variant<Dictionary, Error> WindowClient::dictionary(std::string_view member) {
-  auto answer = call(member, std::nullopt);
+std::variant<Dictionary, Error> WindowClient::dictionary(std::string_view member,
+                                                         const std::optional<std::string_view>& argument) {
+  auto answer = call(member, argument);
   if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
   BodyReader in(std::get<Message>(answer));
   Dictionary result;

@@ -23,7 +23,9 @@ class WindowClient {
   static constexpr int32_t kNoDaemon = 3;
   [[nodiscard]] static std::variant<WindowClient, Error> connect(const std::string& root);
 
-  [[nodiscard]] std::variant<Dictionary, Error> dictionary(std::string_view member);                 // a{sv}
+  // With one text as argument, or with none.
+  [[nodiscard]] std::variant<Dictionary, Error> dictionary(
+      std::string_view member, const std::optional<std::string_view>& argument = std::nullopt);      // a{sv}
   [[nodiscard]] std::variant<std::vector<Dictionary>, Error> dictionaries(std::string_view member);  // aa{sv}
   [[nodiscard]] std::variant<std::string, Error> text(std::string_view member);                      // s
   [[nodiscard]] std::variant<std::vector<std::string>, Error> texts(std::string_view member);        // as

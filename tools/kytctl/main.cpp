@@ -123,11 +123,16 @@ void addExplain(const Command& program, Arguments& a) {
   explain.option("--client", o.client, "The client's name in the user information").excludes(userInfo);
   explain.option("--service", o.service, "The service's name in the user information").excludes(userInfo);
   explain.flag("--single", o.single, "A single message, without a session");
-  explain.option("--storebag", o.storebag,
-                 "A document, or a bag not signed yet (.json, .toml, .plist), instead of the server's");
+  const CommandOption bag = explain.option(
+      "--storebag", o.storebag,
+      "A document, or a bag not signed yet (.json, .toml, .plist), instead of the one in force");
+  explain.flag("--fetch", o.fetch, "The server's storebag, also where a running daemon has one")
+      .excludes(bag);
   const CommandOption pid = explain.option("--pid", o.program.pid, "The program, a process")
                                 .between(1, std::numeric_limits<int32_t>::max());
   explain.option("--user", o.program.user, "Any process of a user instead; your own without either")
+      .excludes(pid);
+  explain.option("--program", o.program.program, "Of that user, one that runs this program file")
       .excludes(pid);
   explain.option("--draw", o.draw, "The session's sampling draw, 0 to 1; all are tried without")
       .between(0.0, 1.0);

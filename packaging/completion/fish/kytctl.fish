@@ -8,7 +8,7 @@ function __kytctl_words
             set value 0
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
                 --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
-                --service --storebag --draw --events --devices --seed \
+                --service --storebag --program --draw --events --devices --seed \
                 --serial --expires-in-days --to --name --ca-file --identifier --set
             set value 1
         else if not string match -q -- '-*' $word
@@ -114,9 +114,11 @@ complete -c kytctl -n '__kytctl_at -b explain' -l session-info -x -d 'A JSON obj
 complete -c kytctl -n '__kytctl_at -b explain' -l client -x -d 'The name of the client'
 complete -c kytctl -n '__kytctl_at -b explain' -l service -x -d 'The name of the service'
 complete -c kytctl -n '__kytctl_at -b explain' -l single -d 'A single message'
-complete -c kytctl -n '__kytctl_at -b explain' -l storebag -r -F -d 'A storebag instead of the one of the server'
+complete -c kytctl -n '__kytctl_at -b explain' -l storebag -r -F -d 'A storebag instead of the one in force'
 complete -c kytctl -n '__kytctl_at -b explain' -l pid -x -a '(__fish_complete_pids)' -d 'The program, a process'
 complete -c kytctl -n '__kytctl_at -b explain' -l user -x -a '(__fish_complete_users)' -d 'Any process of a user'
+complete -c kytctl -n '__kytctl_at -b explain' -l program -r -F -d 'Of that user, one that runs this program'
+complete -c kytctl -n '__kytctl_at -b explain' -l fetch -d 'The storebag of the server'
 complete -c kytctl -n '__kytctl_at -b explain' -l draw -x -d 'The sampling draw, 0 to 1'
 complete -c kytctl -n '__kytctl_at -b explain' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at -b send' -l category -x -d 'The category of the event'
