@@ -57,6 +57,16 @@ class StageTest : public ::testing::Test {
     ASSERT_FALSE(problem) << problem->localizedDescription;
   }
 
+  // A stage whose storebag "cadmor" has one client entry, "person", changed or without something.
+  void layWithPerson(const Dictionary& changes = {}, tools::Stage::Options options = {},
+                     const std::string& without = {}) {
+    lay(std::move(options));
+    Dictionary client = entry("person");
+    for (const DictionaryEntry& change : changes) client.set(change.key, change.value);
+    if (!without.empty()) client.remove(without);
+    putBag("cadmor", {client});
+  }
+
   [[nodiscard]] std::string socket() const { return stage_->socketPath(); }
   // Whether each thread of this process has taken a SIGSTOP: kill() returns before.
   static bool standsStill(int process) {

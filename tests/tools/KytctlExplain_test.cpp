@@ -13,15 +13,6 @@ const std::string kEvent = R"({"Category":3,"Type":4,"Payload":{"step":1}})";
 
 class KytctlExplain : public StageTest {
  protected:
-  // One client entry, changed as the test has it.
-  void prepare(const Dictionary& changes = {}, tools::Stage::Options options = {},
-               const std::string& without = {}) {
-    lay(std::move(options));
-    Dictionary client = entry("person");
-    for (const DictionaryEntry& change : changes) client.set(change.key, change.value);
-    if (!without.empty()) client.remove(without);
-    putBag("cadmor", {client});
-  }
   [[nodiscard]] ProgramRun run(std::vector<std::string> further = {}, const std::string& event = kEvent,
                                const std::string& input = {}) const {
     std::vector<std::string> arguments = {"explain",  event,    "--client-type",      "20",
@@ -78,8 +69,8 @@ class KytctlExplain : public StageTest {
 };
 
 TEST_F(KytctlExplain, ShowsTheRecordThatTheDaemonThenSends) {
-  prepare({{"filters", Array{Dictionary{{"key", "secret"}, {"action", "remove"}},
-                             Dictionary{{"key", "email"}, {"action", "sha256"}}}}});
+  layWithPerson({{"filters", Array{Dictionary{{"key", "secret"}, {"action", "remove"}},
+                                   Dictionary{{"key", "email"}, {"action", "sha256"}}}}});
   const std::string payload = R"({"step":1,"secret":"x","email":"a@b","ClientName":"other","deep":[1]})";
   const Dictionary told = report({}, R"({"Category":3,"Type":4,"Payload":)" + payload + "}");
   EXPECT_EQ(status_, 0);
@@ -118,7 +109,7 @@ TEST_F(KytctlExplain, ShowsTheRecordThatTheDaemonThenSends) {
 }
 
 TEST_F(KytctlExplain, ShowsAddressHeadersAndTheRulesWithWhatTheyLookedAt) {
-  prepare();
+  layWithPerson();
   const Dictionary told = report();
   EXPECT_EQ(status_, 0);
   const Dictionary post = first(told, "posts");
@@ -138,7 +129,7 @@ TEST_F(KytctlExplain, ShowsAddressHeadersAndTheRulesWithWhatTheyLookedAt) {
 }
 
 TEST_F(KytctlExplain, StoresNothing) {
-  prepare({{"custom_clientId", true}});
+  layWithPerson({{"custom_clientId", true}});
   EXPECT_EQ(run().status, 0);
   EXPECT_FALSE(std::filesystem::exists(stage_->folder() +
                                        "/var/lib/kytreportingd/defaults/com.vantu.kytreporting.toml"));
@@ -146,7 +137,7 @@ TEST_F(KytctlExplain, StoresNothing) {
 }
 
 TEST_F(KytctlExplain, ShowsTheDevicesIdentifierAndSaysWhereThereIsNone) {
-  prepare();
+  layWithPerson();
   const auto identifier = [](const Dictionary& told) {
     return description(*first(told, "posts").dictionary("message")->find("clientId"));
   };
@@ -161,7 +152,7 @@ TEST_F(KytctlExplain, ShowsTheDevicesIdentifierAndSaysWhereThereIsNone) {
 TEST_F(KytctlExplain, NamesTheRuleThatKeepsAnEvent) {
   tools::Stage::Options options;
   options.consent = false;
-  prepare({}, std::move(options));
+  layWithPerson({}, std::move(options));
   const Dictionary told = report();
   expectLost(told, "consent-missing");
   EXPECT_EQ(ruleIn(told, "consent"), "fails 0");
@@ -169,7 +160,7 @@ TEST_F(KytctlExplain, NamesTheRuleThatKeepsAnEvent) {
 }
 
 TEST_F(KytctlExplain, TriesAllDrawsOfSamplingUnlessOneIsGiven) {
-  prepare({{"sampling_threshold", 0.3}});
+  layWithPerson({{"sampling_threshold", 0.3}});
   const Dictionary told = report();
   EXPECT_EQ(status_, 2);
   EXPECT_EQ(description(*told.find("verdict")), "cannot-be-told");
@@ -180,12 +171,12 @@ TEST_F(KytctlExplain, TriesAllDrawsOfSamplingUnlessOneIsGiven) {
 }
 
 TEST_F(KytctlExplain, AnExpediteFlagSendsWhatSamplingHolds) {
-  prepare({{"sampling_threshold", 0.3}});
+  layWithPerson({{"sampling_threshold", 0.3}});
   EXPECT_EQ(run({"--draw", "0.5"}, R"({"Category":3,"Type":4,"Flag":2})").status, 0);
 }
 
 TEST_F(KytctlExplain, WhatCannotBeReadLeadsToCannotBeTold) {
-  prepare();
+  layWithPerson();
   const std::string consent = stage_->folder() + "/var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml";
   ASSERT_FALSE(tools::writeFile(consent, "consent = perhaps\n", 0644));
   const Dictionary told = report();
@@ -195,7 +186,7 @@ TEST_F(KytctlExplain, WhatCannotBeReadLeadsToCannotBeTold) {
 }
 
 TEST_F(KytctlExplain, AServerThatDoesNotAnswerLeadsToCannotBeTold) {
-  prepare();
+  layWithPerson();
   const std::string settings = stage_->folder() + "/etc/kytreportingd/kytreportingd.toml";
   ASSERT_FALSE(tools::writeFile(settings,
                                 "[storebag]\ninternal_host = \"https://127.0.0.1:1\"\n"
@@ -208,7 +199,7 @@ TEST_F(KytctlExplain, AServerThatDoesNotAnswerLeadsToCannotBeTold) {
 }
 
 TEST_F(KytctlExplain, TakesABagThatNobodyHasSigned) {
-  prepare();
+  layWithPerson();
   const std::string bag = stage_->folder() + "/draft.toml";
   ASSERT_FALSE(tools::writeFile(bag,
                                 "version = \"draft\"\n[[release.httppost.clients]]\nclient = \"person\"\n"
@@ -223,7 +214,7 @@ TEST_F(KytctlExplain, TakesABagThatNobodyHasSigned) {
 }
 
 TEST_F(KytctlExplain, ChecksTheSignatureOfADocument) {
-  prepare();
+  layWithPerson();
   const std::string document = stage_->folder() + "/bags/cadmor.plist";
   EXPECT_EQ(run({"--storebag", document}).status, 0);
   ASSERT_EQ(kytctl({"keys", "make", stage_->folder() + "/other"}).status, 0);
@@ -236,20 +227,20 @@ TEST_F(KytctlExplain, ChecksTheSignatureOfADocument) {
 }
 
 TEST_F(KytctlExplain, ASingleMessageThatIsBatchedIsLost) {
-  prepare({{"expedite", 0}});
+  layWithPerson({{"expedite", 0}});
   expectLost(report({"--single"}), "batch-discarded");
   EXPECT_EQ(run().status, 0) << "a session flushes";
 }
 
 TEST_F(KytctlExplain, ReadsTheEventFromStandardInput) {
-  prepare();
+  layWithPerson();
   EXPECT_EQ(run({}, "-", kEvent).status, 0);
   EXPECT_EQ(run({}, "-", "{").status, 2);
   EXPECT_EQ(run({}, "[1]").status, 2);
 }
 
 TEST_F(KytctlExplain, WritesLinesOfAtMostAHundredColumns) {
-  prepare();
+  layWithPerson();
   const ProgramRun told =
       run({"--service", std::string(300, 's')},
           R"({"Category":3,"Type":4,"Payload":{"long":")" + std::string(500, 'x') + R"("}})");
@@ -261,14 +252,14 @@ TEST_F(KytctlExplain, WritesLinesOfAtMostAHundredColumns) {
 }
 
 TEST_F(KytctlExplain, LooksForTheProgramsEntitlement) {
-  prepare();
+  layWithPerson();
   std::filesystem::remove(stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml");
   expectLost(report(), "unentitled-connection");
   EXPECT_EQ(run({"--user", "nobody-of-that-name"}).status, 2);
 }
 
 TEST_F(KytctlExplain, TakesTheBagThatTheRunningDaemonHas) {
-  prepare();
+  layWithPerson();
   startDaemon();
   const auto from = [](const Dictionary& told) {
     return description(*told.dictionary("storebag")->find("from"));
@@ -298,7 +289,7 @@ TEST_F(KytctlExplain, TakesTheBagThatTheRunningDaemonHas) {
 TEST_F(KytctlExplain, AsksTheServerWhereTheDaemonWillDoSoForTheNextSession) {
   tools::Stage::Options options;
   options.serverArguments = {"--max-age", "1"};
-  prepare({}, std::move(options));
+  layWithPerson({}, std::move(options));
   startDaemon();
   {
     TestClient client(socket(), 20, "person");
@@ -310,7 +301,7 @@ TEST_F(KytctlExplain, AsksTheServerWhereTheDaemonWillDoSoForTheNextSession) {
 
 TEST_F(KytctlExplain, LooksForTheEntitlementOfAProgramFile) {
   if (!kernelTellsPeerProcess()) GTEST_SKIP() << "this kernel does not tell which process is connected";
-  prepare();
+  layWithPerson();
   const std::string client = stage_->program("kytctl");
   ASSERT_FALSE(tools::writeFile(
       stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml",

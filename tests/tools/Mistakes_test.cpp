@@ -27,11 +27,7 @@ class Mistakes : public StageTest {
   // One client entry, changed as the mistake has it.
   void start(const Dictionary& changes = {}, tools::Stage::Options options = {},
              const std::string& without = {}) {
-    lay(std::move(options));
-    Dictionary client = entry("person");
-    for (const DictionaryEntry& change : changes) client.set(change.key, change.value);
-    if (!without.empty()) client.remove(without);
-    putBag("cadmor", {client});
+    layWithPerson(changes, std::move(options), without);
     startDaemon();
   }
   [[nodiscard]] ProgramRun send(const std::string& name = "person", const std::string& type = "20") const {

@@ -32,11 +32,7 @@ class Place : public StageTest {
   // The entry is changed, or lacks something. The daemon is started by those who need it.
   void prepare(const Dictionary& changes = {}, const std::string& without = {},
                tools::Stage::Options options = {}) {
-    lay(std::move(options));
-    Dictionary client = entry("person");
-    for (const DictionaryEntry& change : changes) client.set(change.key, change.value);
-    if (!without.empty()) client.remove(without);
-    putBag("cadmor", {client});
+    layWithPerson(changes, std::move(options), without);
   }
   [[nodiscard]] std::string path(const std::string& below) const { return stage_->folder() + "/" + below; }
   [[nodiscard]] std::string explain(std::vector<std::string> further = {}, const std::string& event = kEvent,
