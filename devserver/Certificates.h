@@ -8,11 +8,11 @@
 #include <variant>
 #include <vector>
 
+#include "http/HttpServer.h"
+
 namespace kyt::devserver {
 
-struct Identity {
-  std::string certificate, key;  // PEM
-};
+using http::Identity;
 
 // Reads or makes `ca.pem`, `ca-key.pem`, `server.pem` and `server-key.pem` in the folder; keys are readable
 // by the owner alone. The server's certificate is made again when less than thirty days are left to it, when

@@ -6,11 +6,11 @@
 #include <string>
 #include <vector>
 
+#include "http/Http.h"
+
 namespace kyt::devserver {
 
-struct Header {
-  std::string name, value;
-};
+using http::Header;
 
 // One record of a post's "events"; what a record lacks is absent.
 struct Event {

@@ -1,7 +1,5 @@
 #include "devserver/PostChecker.h"
 
-#include <openssl/evp.h>
-#include <openssl/hmac.h>
 #include <rapidjson/document.h>
 #include <rapidjson/error/en.h>
 #include <rapidjson/prettywriter.h>
@@ -10,9 +8,10 @@
 
 #include <algorithm>
 
-#include "devserver/Gzip.h"
+#include "devserver/Http.h"
 #include "devserver/Text.h"
-#include "platform/base/Hex.h"
+#include "http/Gzip.h"
+#include "http/PostDigest.h"
 
 namespace kyt::devserver {
 namespace {
@@ -144,31 +143,12 @@ std::optional<std::string> readMessage(const std::string& text, Post& post) {
 
 }  // namespace
 
-const std::string* findHeader(const std::vector<Header>& headers, std::string_view name) {
-  const auto found = std::find_if(headers.begin(), headers.end(),
-                                  [&](const Header& header) { return equalIgnoringCase(header.name, name); });
-  return found == headers.end() ? nullptr : &found->value;
-}
-
 std::optional<std::string> rewriteJson(std::string_view text, bool pretty) {
   if (depthOf(text) > kMaxDepth) return std::nullopt;
   rapidjson::Document document;
   document.Parse<kParseFlags>(text.data(), text.size());
   if (document.HasParseError()) return std::nullopt;
   return pretty ? written<rapidjson::PrettyWriter<rapidjson::StringBuffer>>(document) : written(document);
-}
-
-std::string digestText(std::string_view key, std::string_view body) {
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned size = 0;
-  HMAC(EVP_sha1(), key.data(), static_cast<int>(key.size()),
-       reinterpret_cast<const unsigned char*>(body.data()), body.size(), digest, &size);
-  std::string text = "<";
-  for (unsigned i = 0; i < size; ++i) {
-    if (i > 0 && i % 4 == 0) text += ' ';
-    appendHexByte(digest[i], text);
-  }
-  return text + ">";
 }
 
 void PostChecker::readNames(Post& post) {
@@ -203,9 +183,9 @@ std::optional<std::string> PostChecker::textOf(const std::vector<Header>& header
     reason = "Content-Encoding \"" + printable(*encoding) + "\" is not gzip";
     return std::nullopt;
   }
-  auto result = gunzip(body, maxInflatedBytes_);
+  auto result = http::gunzip(body, maxInflatedBytes_);
   if (auto* text = std::get_if<std::string>(&result)) return std::move(*text);
-  reason = std::get<GzipError>(result).reason;
+  reason = std::get<http::GzipError>(result).reason;
   return std::nullopt;
 }
 
@@ -225,7 +205,7 @@ bool PostChecker::checkDigest(Post& post) const {
     return false;
   }
   const bool good = std::any_of(keys.begin(), keys.end(), [&](const DigestKey* key) {
-    return digestText(key->key, post.body) == *header;
+    return http::digestFits(key->key, post.body, *header);
   });
   post.digest = good ? "good" : "bad";
   if (!good) post.reason = "X-KYT-DIGEST does not fit the body and a known key";

@@ -34,13 +34,7 @@ class PostChecker {
   const uint64_t maxInflatedBytes_;
 };
 
-// The value of a header, whatever the case of its name, or null.
-[[nodiscard]] const std::string* findHeader(const std::vector<Header>& headers, std::string_view name);
-
 // The same JSON, compact or indented, or nothing when it is malformed or nested too deeply.
 [[nodiscard]] std::optional<std::string> rewriteJson(std::string_view text, bool pretty);
-
-// HMAC-SHA1 as posts carry it: "<0a1b2c3d 4e5f6071 8293a4b5 c6d7e8f9 0a1b2c3d>".
-[[nodiscard]] std::string digestText(std::string_view key, std::string_view body);
 
 }  // namespace kyt::devserver

@@ -13,10 +13,12 @@
 #include "devserver/ReplyRules.h"
 #include "devserver/Store.h"
 #include "devserver/Storebags.h"
-#include "devserver/Suspensions.h"
 #include "devserver/Uploads.h"
+#include "http/Suspensions.h"
 
 namespace kyt::devserver {
+
+using http::Suspensions;
 
 class Router final : public HttpHandler {
  public:

@@ -1,30 +1,18 @@
-// Small helpers for text that crosses the server's borders. Any thread, no state.
+// Texts that cross the server's borders (http/Text.h), by the names that its code uses.
 #pragma once
 
-#include <cstdint>
-#include <ctime>
-#include <optional>
-#include <string>
-#include <string_view>
+#include "http/Text.h"
 
 namespace kyt::devserver {
 
-// The same text in valid UTF-8: every byte that is part of no well-formed character becomes \xNN.
-[[nodiscard]] std::string validText(std::string_view bytes);
-
-// The text with control characters as \xNN, for terminals.
-[[nodiscard]] std::string printable(std::string_view bytes);
-
-[[nodiscard]] bool equalIgnoringCase(std::string_view a, std::string_view b);
-[[nodiscard]] std::optional<int64_t> parseInteger(std::string_view text);  // the whole text, decimal
-[[nodiscard]] std::optional<double> parseNumber(std::string_view text);    // the whole text, finite
-[[nodiscard]] std::optional<std::string> bytesFromHex(std::string_view text);
-[[nodiscard]] std::string base64(std::string_view bytes);
-
-// "Sat, 31 Jan 2026 12:00:00 GMT"
-[[nodiscard]] std::string httpDate(std::time_t time);
-
-// Seconds since 1970.
-[[nodiscard]] double timeNow();
+using http::base64;
+using http::bytesFromHex;
+using http::equalIgnoringCase;
+using http::httpDate;
+using http::parseInteger;
+using http::parseNumber;
+using http::printable;
+using http::timeNow;
+using http::validText;
 
 }  // namespace kyt::devserver

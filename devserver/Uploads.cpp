@@ -6,9 +6,9 @@
 #include <variant>
 
 #include "devserver/Files.h"
-#include "devserver/Gzip.h"
 #include "devserver/PostChecker.h"
 #include "devserver/Text.h"
+#include "http/Gzip.h"
 
 namespace kyt::devserver {
 namespace {
@@ -43,8 +43,8 @@ void Uploads::keep(const Request& request, Post& post) const {
     post.reason = "Content-Encoding is not gzip";
     return;
   }
-  const auto contents = gunzip(post.body, maxInflatedBytes_);
-  if (const auto* wrong = std::get_if<GzipError>(&contents)) {
+  const auto contents = http::gunzip(post.body, maxInflatedBytes_);
+  if (const auto* wrong = std::get_if<http::GzipError>(&contents)) {
     post.reason = wrong->reason;
     return;
   }

@@ -15,15 +15,19 @@
 #include "devserver/Certificates.h"
 #include "devserver/DashboardFeed.h"
 #include "devserver/Files.h"
-#include "devserver/HttpServer.h"
 #include "devserver/JsonText.h"
 #include "devserver/Options.h"
 #include "devserver/Router.h"
 #include "devserver/Rows.h"
+#include "http/HttpServer.h"
 #include "platform/linux/cli/CommandLine.h"
 
 namespace kyt::devserver {
 namespace {
+
+using http::HttpServer;
+using http::ServerOptions;
+using http::Suspensions;
 
 int fail(const std::string& what) {
   std::fprintf(stderr, "kytdevserver: %s\n", what.c_str());
@@ -144,10 +148,12 @@ int serve(const Options& options, const sigset_t& signals) {
   const PostChecker checker(options.digestKeys, options.maxInflatedBytes);
   AcknowledgementRules acknowledgements;
   Router router(options, *store, checker, stream, suspensions, acknowledgements, signer);
-  const auto https = HttpServer::start(options, options.httpsPort, &std::get<Identity>(identity), router,
-                                       suspensions, error);
-  const auto http =
-      https ? HttpServer::start(options, options.httpPort, nullptr, router, suspensions, error) : nullptr;
+  ServerOptions port = {options.listen, options.httpsPort};
+  port.maxConnections = options.maxConnections;
+  port.requestTime = options.requestTimeout;
+  const auto https = HttpServer::start(port, &std::get<Identity>(identity), router, suspensions, error);
+  port.port = options.httpPort;
+  const auto http = https ? HttpServer::start(port, nullptr, router, suspensions, error) : nullptr;
 
   std::unique_ptr<DashboardFeed> feed;
   if (http && options.udpPort)

@@ -21,11 +21,11 @@
 #include <vector>
 
 #include "devserver/Files.h"
-#include "devserver/Gzip.h"
-#include "devserver/HttpServer.h"
+#include "http/Gzip.h"
+#include "http/HttpServer.h"
 #include "platform/base/Mutex.h"
 
-namespace kyt::devserver {
+namespace kyt::http {
 namespace {
 
 constexpr uint64_t kMostBytes = 64 << 20, kMostEvents = 1 << 24;
@@ -91,18 +91,18 @@ class Books : public HttpHandler {
 };
 
 int serve(const char* certificate, const char* key) {
-  const auto chain = readFile(certificate, 1 << 16), secret = readFile(key, 1 << 16);
+  const auto chain = devserver::readFile(certificate, 1 << 16), secret = devserver::readFile(key, 1 << 16);
   if (!chain || !secret) {
     std::fprintf(stderr, "kyt_soak_sink: cannot read its certificate or key\n");
     return 1;
   }
   const Identity identity{*chain, *secret};
-  const Options options;
+  const ServerOptions options;
   Books books;
   Suspensions suspensions([] {});
   std::string error;
-  const auto plain = HttpServer::start(options, 0, nullptr, books, suspensions, error);
-  const auto tls = plain ? HttpServer::start(options, 0, &identity, books, suspensions, error) : nullptr;
+  const auto plain = HttpServer::start(options, nullptr, books, suspensions, error);
+  const auto tls = plain ? HttpServer::start(options, &identity, books, suspensions, error) : nullptr;
   if (!tls) {
     std::fprintf(stderr, "kyt_soak_sink: %s\n", error.c_str());
     return 1;
@@ -117,7 +117,7 @@ int serve(const char* certificate, const char* key) {
 }
 
 }  // namespace
-}  // namespace kyt::devserver
+}  // namespace kyt::http
 
 int main(int argc, char** argv) {
   if (argc != 3) {
@@ -125,5 +125,5 @@ int main(int argc, char** argv) {
     return 2;
   }
   std::signal(SIGPIPE, SIG_IGN);
-  return kyt::devserver::serve(argv[1], argv[2]);
+  return kyt::http::serve(argv[1], argv[2]);
 }

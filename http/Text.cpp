@@ -1,4 +1,4 @@
-#include "devserver/Text.h"
+#include "http/Text.h"
 
 #include <array>
 #include <charconv>
@@ -8,7 +8,7 @@
 #include "platform/base/Hex.h"
 #include "platform/base/TextEscape.h"
 
-namespace kyt::devserver {
+namespace kyt::http {
 namespace {
 
 void appendEscape(std::string& out, char c) {
@@ -113,4 +113,4 @@ double timeNow() {
   return std::chrono::duration<double>(now).count();
 }
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http

@@ -6,7 +6,7 @@
 #include <string_view>
 #include <variant>
 
-namespace kyt::devserver {
+namespace kyt::http {
 
 struct GzipError {
   std::string reason;
@@ -15,4 +15,4 @@ struct GzipError {
 // Exactly one gzip member and nothing behind it; an output over `limit` bytes is an error.
 [[nodiscard]] std::variant<std::string, GzipError> gunzip(std::string_view bytes, uint64_t limit);
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http

@@ -1,8 +1,8 @@
-#include "devserver/Gzip.h"
+#include "http/Gzip.h"
 
 #include <zlib.h>
 
-namespace kyt::devserver {
+namespace kyt::http {
 
 std::variant<std::string, GzipError> gunzip(std::string_view bytes, uint64_t limit) {
   z_stream stream{};
@@ -37,4 +37,4 @@ std::variant<std::string, GzipError> gunzip(std::string_view bytes, uint64_t lim
   return out;
 }
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http

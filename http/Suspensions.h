@@ -11,10 +11,10 @@
 #include <map>
 #include <thread>
 
-#include "devserver/Http.h"
+#include "http/Http.h"
 #include "platform/base/Mutex.h"
 
-namespace kyt::devserver {
+namespace kyt::http {
 
 class Suspensions {
  public:
@@ -48,4 +48,4 @@ class Suspensions {
   std::thread thread_;
 };
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http

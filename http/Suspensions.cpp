@@ -1,10 +1,10 @@
-#include "devserver/Suspensions.h"
+#include "http/Suspensions.h"
 
 #include <pthread.h>
 
 #include <algorithm>
 
-namespace kyt::devserver {
+namespace kyt::http {
 namespace {
 
 constexpr std::chrono::seconds kTick(5);
@@ -77,4 +77,4 @@ void Suspensions::run() {
   }
 }
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http

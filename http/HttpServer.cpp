@@ -1,4 +1,4 @@
-#include "devserver/HttpServer.h"
+#include "http/HttpServer.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -7,14 +7,18 @@
 
 #include <cerrno>
 #include <cstring>
+#include <utility>
+#include <vector>
 
-#include "devserver/EventStream.h"
-#include "devserver/Text.h"
+#include "http/LaterReply.h"
+#include "http/StreamQueue.h"
+#include "http/Text.h"
 
-namespace kyt::devserver {
+namespace kyt::http {
 namespace {
 
-constexpr unsigned kThreads = 2;
+// At most so much of a body gets its room at once, whatever its length is said to be.
+constexpr uint64_t kFirstRoom = 65536;
 
 MHD_Result collect(void* into, MHD_ValueKind, const char* name, const char* value) {
   static_cast<std::vector<Header>*>(into)->push_back({name, value != nullptr ? value : ""});
@@ -31,12 +35,13 @@ void freeStream(void* context) {
   delete static_cast<std::pair<std::shared_ptr<StreamQueue>, MHD_Connection*>*>(context);
 }
 
-MHD_Result send(MHD_Connection* connection, const Reply& reply) {
+MHD_Result send(MHD_Connection* connection, const Reply& reply, bool isLast) {
   if (reply.close) return MHD_NO;
   MHD_Response* response = MHD_create_response_from_buffer(
       reply.body.size(), const_cast<char*>(reply.body.data()), MHD_RESPMEM_MUST_COPY);
   if (!reply.body.empty()) MHD_add_response_header(response, "Content-Type", reply.type.c_str());
   MHD_add_response_header(response, "X-Content-Type-Options", "nosniff");
+  if (isLast) MHD_add_response_header(response, "Connection", "close");
   for (const Header& header : reply.headers) {
     MHD_add_response_header(response, header.name.c_str(), header.value.c_str());
   }
@@ -85,11 +90,21 @@ int listenOn(const std::string& address, uint16_t port, std::string& error) {
 
 }  // namespace
 
+// What is known of a connection besides its requests. The mutex guards the times, since others read them.
+struct HttpServer::Connection {
+  int descriptor = -1;
+  SteadyTime since = std::chrono::steady_clock::now();  // its beginning, or its last answer
+  bool hasRequest = false;                              // its headers are there
+  bool hasBody = false;  // … and its body is whole: what follows takes our time
+};
+
 // One request from its headers to its answer. Belongs to the connection's thread.
 class HttpServer::Exchange {
  public:
   Exchange(HttpServer& server, MHD_Connection* connection, const char* path, const char* method)
       : server_(server), connection_(connection) {
+    ++server_.inProgress_;
+    mark(true, false);
     request_.method = method;
     request_.path = path;
     request_.secure = server.secure_;
@@ -102,10 +117,23 @@ class HttpServer::Exchange {
     }
     limit_ = server.handler_.bodyLimit(request_);
     request_.tooLarge = request_.contentLength && *request_.contentLength > limit_;
+    if (request_.contentLength && !request_.tooLarge)
+      request_.body.reserve(std::min(*request_.contentLength, kFirstRoom));
   }
+  ~Exchange() {
+    server_.bodiesBytes_ -= kept_;
+    mark(false, false);
+    --server_.inProgress_;
+  }
+  Exchange(const Exchange&) = delete;
+  Exchange& operator=(const Exchange&) = delete;
 
   // The headers are there. A client that asks before it sends too much is answered at once.
   MHD_Result begin() {
+    if (const std::optional<Reply> refusal = server_.handler_.refusal(request_)) {
+      answered_ = true;
+      return send(connection_, *refusal, true);
+    }
     if (request_.tooLarge && request_.header("Expect") != nullptr) return conclude();
     return MHD_YES;
   }
@@ -113,11 +141,8 @@ class HttpServer::Exchange {
   MHD_Result take(const char* bytes, size_t* size) {
     request_.bodySize += *size;
     if (request_.bodySize > limit_) request_.tooLarge = true;
-    if (request_.tooLarge) {
-      request_.body.clear();
-    } else {
-      request_.body.append(bytes, *size);
-    }
+    if (!request_.tooLarge && !request_.noRoom) keep({bytes, *size});
+    if (request_.tooLarge) request_.body.clear();
     *size = 0;
     if (std::chrono::steady_clock::now() - request_.began <= server_.bodyTime_) return MHD_YES;
     request_.tooSlow = true;
@@ -130,27 +155,59 @@ class HttpServer::Exchange {
   MHD_Result conclude() {
     if (!answered_) {
       answered_ = true;
+      mark(true, true);
       answer_ = server_.handler_.answer(request_);
     }
-    if (auto* reply = std::get_if<Reply>(&answer_)) return send(connection_, *reply);
+    if (auto* reply = std::get_if<Reply>(&answer_)) return finish(*reply);
     if (auto* stream = std::get_if<std::shared_ptr<StreamQueue>>(&answer_))
       return sendStream(connection_, *stream);
+    if (auto* later = std::get_if<std::shared_ptr<LaterReply>>(&answer_)) {
+      const std::optional<Reply> reply = (*later)->takeOrSuspend(connection_);
+      return reply ? finish(*reply) : MHD_YES;
+    }
     return wait(std::get<Wait>(answer_));
   }
 
   void end(MHD_RequestTerminationCode code) {
     if (answered_) return;
-    request_.tooSlow = code == MHD_REQUEST_TERMINATED_TIMEOUT_REACHED;
+    const bool isLate = std::chrono::steady_clock::now() - request_.began > server_.bodyTime_;
+    request_.tooSlow = isLate || code == MHD_REQUEST_TERMINATED_TIMEOUT_REACHED;
     server_.handler_.broken(request_);
   }
 
  private:
+  // Takes room for the bytes from that of all requests.
+  void keep(std::string_view bytes) {
+    if ((server_.bodiesBytes_ += bytes.size()) > server_.maxBodiesBytes_) {
+      server_.bodiesBytes_ -= bytes.size();
+      request_.noRoom = true;
+      request_.body.clear();
+      return;
+    }
+    kept_ += bytes.size();
+    request_.body.append(bytes);
+  }
+
+  void mark(bool hasRequest, bool hasBody) {
+    const MHD_ConnectionInfo* info = MHD_get_connection_info(connection_, MHD_CONNECTION_INFO_SOCKET_CONTEXT);
+    if (info == nullptr || info->socket_context == nullptr) return;
+    auto& connection = *static_cast<Connection*>(info->socket_context);
+    MutexLock lock(server_.mutex_);
+    connection.since = std::chrono::steady_clock::now();
+    connection.hasRequest = hasRequest;
+    connection.hasBody = hasBody;
+  }
+
+  MHD_Result finish(const Reply& reply) {
+    return send(connection_, reply, server_.refusesConnections_.load(std::memory_order_relaxed));
+  }
+
   MHD_Result wait(Wait& wait) {
     for (;;) {
       const uint64_t generation = server_.suspensions_.generation();
       const bool expired =
           std::chrono::steady_clock::now() >= wait.deadline || server_.suspensions_.stopped();
-      if (const std::optional<Reply> reply = wait.poll(expired)) return send(connection_, *reply);
+      if (const std::optional<Reply> reply = wait.poll(expired)) return finish(*reply);
       if (expired) return MHD_NO;
       if (server_.suspensions_.suspend(connection_, wait, generation)) return MHD_YES;
     }
@@ -160,7 +217,7 @@ class HttpServer::Exchange {
   MHD_Connection* connection_;
   Request request_;
   Answer answer_;
-  uint64_t limit_ = 0;
+  uint64_t limit_ = 0, kept_ = 0;
   bool answered_ = false;
 };
 
@@ -183,32 +240,65 @@ void HttpServer::onEnd(void* /*self*/, MHD_Connection* /*connection*/, void** ex
   if (ended) ended->end(code);
 }
 
-std::unique_ptr<HttpServer> HttpServer::start(const Options& options, uint16_t port, const Identity* identity,
+void HttpServer::onConnection(void* self, MHD_Connection* connection, void** context,
+                              MHD_ConnectionNotificationCode code) {
+  auto& server = *static_cast<HttpServer*>(self);
+  MutexLock lock(server.mutex_);
+  if (code == MHD_CONNECTION_NOTIFY_STARTED) {
+    const MHD_ConnectionInfo* info = MHD_get_connection_info(connection, MHD_CONNECTION_INFO_CONNECTION_FD);
+    auto made = std::make_unique<Connection>();
+    if (info != nullptr) made->descriptor = info->connect_fd;
+    server.connections_.insert(made.get());
+    *context = made.release();
+  } else if (*context != nullptr) {
+    // The library closes the descriptor after this.
+    const std::unique_ptr<Connection> ended(static_cast<Connection*>(std::exchange(*context, nullptr)));
+    server.connections_.erase(ended.get());
+  }
+}
+
+uint64_t HttpServer::connections() {
+  MutexLock lock(mutex_);
+  return connections_.size();
+}
+
+void HttpServer::endSlowConnections(std::chrono::seconds withoutRequest) {
+  const SteadyTime now = std::chrono::steady_clock::now();
+  MutexLock lock(mutex_);
+  for (const Connection* connection : connections_) {
+    if (connection->hasBody) continue;
+    if (now - connection->since > (connection->hasRequest ? bodyTime_ : withoutRequest))
+      shutdown(connection->descriptor, SHUT_RDWR);
+  }
+}
+
+std::unique_ptr<HttpServer> HttpServer::start(const ServerOptions& options, const Identity* identity,
                                               HttpHandler& handler, Suspensions& suspensions,
                                               std::string& error) {
-  const int listener = listenOn(options.listen, port, error);
+  const int listener = listenOn(options.address, options.port, error);
   if (listener < 0) return nullptr;
   std::unique_ptr<HttpServer> server(new HttpServer(options, identity != nullptr, handler, suspensions));
   // With epoll the library overlooks the end of a connection that came together with its last bytes, until
   // the time-out; poll sees it at once, and suspended connections are not among those it asks about.
   unsigned flags = MHD_USE_POLL_INTERNAL_THREAD | MHD_ALLOW_SUSPEND_RESUME;
   if (identity != nullptr) flags |= MHD_USE_TLS;
-  std::vector<MHD_OptionItem> tls;
+  std::vector<MHD_OptionItem> more;
+  if (options.threads > 1) more.push_back({MHD_OPTION_THREAD_POOL_SIZE, options.threads, nullptr});
   if (identity != nullptr) {
-    tls.push_back({MHD_OPTION_HTTPS_MEM_KEY, 0, const_cast<char*>(identity->key.c_str())});
-    tls.push_back({MHD_OPTION_HTTPS_MEM_CERT, 0, const_cast<char*>(identity->certificate.c_str())});
-    tls.push_back(
+    more.push_back({MHD_OPTION_HTTPS_MEM_KEY, 0, const_cast<char*>(identity->key.c_str())});
+    more.push_back({MHD_OPTION_HTTPS_MEM_CERT, 0, const_cast<char*>(identity->certificate.c_str())});
+    more.push_back(
         {MHD_OPTION_HTTPS_PRIORITIES, 0, const_cast<char*>("NORMAL:-VERS-ALL:+VERS-TLS1.3:+VERS-TLS1.2")});
   }
-  tls.push_back({MHD_OPTION_END, 0, nullptr});
-  server->daemon_ =
-      MHD_start_daemon(flags, port, nullptr, nullptr, &HttpServer::onRequest, server.get(), MHD_OPTION_ARRAY,
-                       tls.data(), MHD_OPTION_LISTEN_SOCKET, listener, MHD_OPTION_THREAD_POOL_SIZE, kThreads,
-                       MHD_OPTION_CONNECTION_LIMIT, options.maxConnections, MHD_OPTION_CONNECTION_TIMEOUT,
-                       static_cast<unsigned>(options.requestTimeout.count()), MHD_OPTION_NOTIFY_COMPLETED,
-                       &HttpServer::onEnd, server.get(), MHD_OPTION_END);
+  more.push_back({MHD_OPTION_END, 0, nullptr});
+  server->daemon_ = MHD_start_daemon(
+      flags, options.port, nullptr, nullptr, &HttpServer::onRequest, server.get(), MHD_OPTION_LISTEN_SOCKET,
+      listener, MHD_OPTION_ARRAY, more.data(), MHD_OPTION_CONNECTION_LIMIT, options.maxConnections,
+      MHD_OPTION_CONNECTION_TIMEOUT, static_cast<unsigned>(options.requestTime.count()),
+      MHD_OPTION_NOTIFY_COMPLETED, &HttpServer::onEnd, server.get(), MHD_OPTION_NOTIFY_CONNECTION,
+      &HttpServer::onConnection, server.get(), MHD_OPTION_END);
   if (server->daemon_ == nullptr) {
-    error = "can't start the server on port " + std::to_string(port);
+    error = "can't start the server on " + options.address + " port " + std::to_string(options.port);
     close(listener);
     return nullptr;
   }
@@ -217,6 +307,12 @@ std::unique_ptr<HttpServer> HttpServer::start(const Options& options, uint16_t p
 
 HttpServer::~HttpServer() {
   if (daemon_ != nullptr) MHD_stop_daemon(daemon_);
+}
+
+void HttpServer::refuseConnections() {
+  if (refusesConnections_.exchange(true)) return;
+  const int listener = MHD_quiesce_daemon(daemon_);
+  if (listener >= 0) close(listener);
 }
 
 uint16_t HttpServer::port() const {
@@ -229,4 +325,4 @@ uint16_t HttpServer::port() const {
                                             : reinterpret_cast<sockaddr_in6*>(&address)->sin6_port);
 }
 
-}  // namespace kyt::devserver
+}  // namespace kyt::http
