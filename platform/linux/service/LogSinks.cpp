@@ -120,9 +120,9 @@ void JournalSink::write(LogLevel level, std::string_view line) {
   entries_.write(entryOfLine(identifier_, level, line));
 }
 
-std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters) {
+std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters, const std::string& identifier) {
   if (target != LogTarget::standardError && JournalSink::isAvailable()) {
-    if (auto journal = JournalSink::open(counters)) return journal;
+    if (auto journal = JournalSink::open(counters, identifier)) return journal;
   }
   return std::make_unique<PatientStderrSink>(counters);
 }

@@ -67,6 +67,7 @@ class JournalSink final : public LogSink {
 };
 
 // The journal when its socket is there and standard error was not asked for.
-[[nodiscard]] std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters);
+[[nodiscard]] std::unique_ptr<LogSink> makeLogSink(LogTarget target, Counters& counters,
+                                                   const std::string& identifier = "kytreportingd");
 
 }  // namespace kyt

@@ -1,0 +1,158 @@
+#include "receiver/Delivery.h"
+
+#include <utility>
+
+#include "receiver/Limits.h"
+
+namespace kyt::receiver {
+
+Delivery::Delivery(EventLog& log, Spool& spool, const Clock& clock, Figures& figures, Log& lines,
+                   Duration publishTime)
+    : log_(log), spool_(spool), clock_(clock), figures_(figures), lines_(lines), publishTime_(publishTime) {}
+
+uint64_t Delivery::enter(Pending pending) {
+  pending.since = clock_.monotonic();
+  MutexLock lock(mutex_);
+  const uint64_t token = ++lastToken_;
+  deadlines_.emplace_back(pending.since + publishTime_, token);
+  pending_.emplace(token, std::move(pending));
+  return token;
+}
+
+void Delivery::take(std::shared_ptr<const LogMessage> message, Done done) {
+  if (!isUp_.load(std::memory_order_relaxed) || !isTrusted_.load(std::memory_order_relaxed))
+    return keep(std::move(message), std::move(done));
+  const uint64_t token = enter({message, std::move(done)});
+  log_.publish(token, std::move(message));
+}
+
+void Delivery::replay(int64_t number, std::shared_ptr<const LogMessage> message) {
+  const uint64_t token = enter({message, {}, number});
+  log_.publish(token, std::move(message));
+}
+
+uint64_t Delivery::pending() {
+  MutexLock lock(mutex_);
+  return pending_.size();
+}
+
+void Delivery::keep(std::shared_ptr<const LogMessage> message, Done done) {
+  spool_.add(std::move(message), [done = std::move(done)](SpoolVerdict verdict) {
+    switch (verdict) {
+      case SpoolVerdict::kept:
+        return done(Fate::spooled);
+      case SpoolVerdict::full:
+        return done(Fate::spoolFull);
+      case SpoolVerdict::broken:
+        return done(Fate::spoolBroken);
+    }
+  });
+}
+
+void Delivery::trust() {
+  if (!isTrusted_.load(std::memory_order_relaxed)) isTrusted_ = true;
+  if (isFailureTold_.load(std::memory_order_relaxed) && isFailureTold_.exchange(false))
+    lines_.normal("log: it takes messages again");
+}
+
+void Delivery::distrust(const char* why) {
+  {
+    MutexLock lock(mutex_);
+    if (isTrusted_.exchange(false)) distrustedAt_ = clock_.monotonic();
+  }
+  if (!isFailureTold_.exchange(true))
+    lines_.error("log: %s; posts go to the spool until it takes messages again", why);
+}
+
+void Delivery::refused(Pending pending) {
+  if (pending.done)
+    keep(std::move(pending.message), std::move(pending.done));
+  else
+    spool_.replayed(pending.number, SpoolReplay::failed);
+}
+
+void Delivery::answered(Pending pending, const LogAnswer& answer) {
+  const bool isReplay = !pending.done;
+  switch (answer.verdict) {
+    case LogVerdict::stored:
+    case LogVerdict::duplicate:
+      figures_.publishTime.add(clock_.monotonic() - pending.since);
+      if (answer.verdict == LogVerdict::duplicate) count(figures_.duplicates);
+      trust();
+      if (isReplay) return spool_.replayed(pending.number, SpoolReplay::stored);
+      return pending.done(Fate::stored);
+    case LogVerdict::refusedForGood:
+      count(figures_.logRefusalsForGood);
+      lines_.error("log: a message is refused for good: %s", answer.text.c_str());
+      trust();
+      if (isReplay) return spool_.replayed(pending.number, SpoolReplay::never);
+      return pending.done(Fate::tooLargeForLog);
+    case LogVerdict::refused:
+      count(figures_.logRefusals);
+      distrust(answer.text.c_str());
+      return refused(std::move(pending));
+  }
+}
+
+void Delivery::logAnswered(uint64_t token, const LogAnswer& answer) {
+  Pending pending;
+  {
+    MutexLock lock(mutex_);
+    const auto known = pending_.find(token);
+    if (known == pending_.end()) return;  // too late: the spool has it, and gives it to the log once more
+    pending = std::move(known->second);
+    pending_.erase(known);
+  }
+  answered(std::move(pending), answer);
+}
+
+void Delivery::logIsUp(bool isUp) {
+  std::vector<Pending> lost;
+  {
+    MutexLock lock(mutex_);
+    if (isUp_.exchange(isUp) == isUp) return;
+    if (isUp) {
+      wasUp_ = true;
+    } else {
+      lost.reserve(pending_.size());
+      for (auto& [token, pending] : pending_) lost.push_back(std::move(pending));
+      pending_.clear();
+      deadlines_.clear();
+    }
+  }
+  if (isUp)
+    lines_.normal("log: it is there");
+  else
+    lines_.error("log: it is not there; posts go to the spool");
+  for (Pending& pending : lost) refused(std::move(pending));
+  if (isUp) {
+    isTrusted_ = true;
+    spool_.wake();
+  }
+}
+
+std::vector<Delivery::Pending> Delivery::takeLate(MonotonicTime now) {
+  std::vector<Pending> late;
+  MutexLock lock(mutex_);
+  while (!deadlines_.empty() && deadlines_.front().first <= now) {
+    if (auto known = pending_.find(deadlines_.front().second); known != pending_.end()) {
+      late.push_back(std::move(known->second));
+      pending_.erase(known);
+    }
+    deadlines_.pop_front();
+  }
+  // Where no post of the spool will show that the log takes messages again, the next of a device may.
+  const bool isShown = spool_.hasReplays() && !spool_.isBroken();
+  if (!isTrusted_ && !isShown && distrustedAt_ + Limits::retryPause <= now) isTrusted_ = true;
+  return late;
+}
+
+void Delivery::tick() {
+  std::vector<Pending> late = takeLate(clock_.monotonic());
+  if (late.empty()) return;
+  count(figures_.logTimeouts, late.size());
+  distrust("a message was not acknowledged in time");
+  for (Pending& pending : late) refused(std::move(pending));
+}
+
+}  // namespace kyt::receiver

@@ -1,0 +1,52 @@
+// What devices, the log and the disk may take of a receiver, each with its unit and reason. What passes one is refused or
+// left out, and counted (Figures.h).
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+
+namespace kyt::receiver {
+
+struct Limits {
+  // Bytes of the bodies of all posts that are not yet answered: memory. Past it posts get 429.
+  static constexpr uint64_t maxBodiesBytes = uint64_t{256} << 20;
+  // Connections of the posts' port: descriptors. Further ones wait to be accepted.
+  static constexpr unsigned maxConnections = 8192;
+  static constexpr unsigned maxMetricsConnections = 16;
+  // For the body of a post to be whole: a slow device holds a connection no longer.
+  static constexpr std::chrono::seconds bodyTime{60};
+  // A connection without a request's headers. Longer than proxies keep their connections to us (nginx: 60 s), so that
+  // it is them who end an idle one, and never with a post on its way.
+  static constexpr std::chrono::seconds idleTime{75};
+  // For posts that are in progress when the process is told to end: the body's rest, and its way to log or spool.
+  static constexpr std::chrono::seconds drainTime{15};
+  // … and for a proxy's next post on a connection that it has open: it learns with the answer that the connection ends.
+  static constexpr std::chrono::seconds quietTime{1};
+  // A post waits for the spool's disk so long; then it gets 429, though it may be kept all the same.
+  static constexpr std::chrono::seconds spoolTime{5};
+  // Posts in one change of the spool's file, and bytes of them: what one fdatasync makes durable, and the memory it takes.
+  static constexpr size_t maxSpoolChangePosts = 512;
+  static constexpr size_t maxSpoolChangeBytes = 16u << 20;
+  // Posts of the spool on their way to the log, and bytes of them.
+  static constexpr size_t maxReplayPosts = 64;
+  static constexpr size_t maxReplayBytes = 32u << 20;
+  // Between attempts to give the spool to a log that does not take it.
+  static constexpr std::chrono::milliseconds replayPause{250};
+  // Of the body of a post that can never be taken, in the dead-letter stream.
+  static constexpr size_t maxDeadLetterBytes = 65536;
+  // Dead letters: whoever sends rubbish cannot fill the log. So many at once, and so many a second.
+  static constexpr unsigned deadLettersAtOnce = 100;
+  static constexpr unsigned deadLettersPerSecond = 10;
+  // After a failure, with no post in the spool to try the log with: until one of a device may.
+  static constexpr std::chrono::milliseconds retryPause{1000};
+  // Bytes of a header that a message carries on; what is longer is cut.
+  static constexpr size_t maxFactBytes = 256;
+  // A post's JSON, where it is looked at: bytes after decompression (a bomb ends there), and nesting.
+  static constexpr uint64_t maxInflatedBytes = uint64_t{128} << 20;
+  static constexpr unsigned maxJSONDepth = 32;
+  // Servers, paths and keys that a configuration may name: more is a mistake.
+  static constexpr size_t maxPartitions = 1024;
+};
+
+}  // namespace kyt::receiver

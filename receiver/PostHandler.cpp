@@ -1,0 +1,112 @@
+#include "receiver/PostHandler.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "receiver/Limits.h"
+
+namespace kyt::receiver {
+namespace {
+
+using http::Answer;
+using http::Reply;
+using http::Request;
+using http::textReply;
+
+// Devices that keep their posts come back after so many seconds.
+constexpr const char* kRetryAfter = "30";
+
+// Whether it can be of use to see it: a wrong address or method is no post.
+bool isDeadLetter(Refusal refusal) {
+  switch (refusal) {
+    case Refusal::unknownPath:
+    case Refusal::wrongMethod:
+    case Refusal::bodiesFull:
+      return false;
+    default:
+      return true;
+  }
+}
+
+}  // namespace
+
+PostHandler::PostHandler(const Settings& settings, Options options, Delivery& delivery, EventLog& log,
+                         DeadLetters& deadLetters, const Clock& clock, Figures& figures)
+    : settings_(settings),
+      options_(options),
+      delivery_(delivery),
+      log_(log),
+      deadLetters_(deadLetters),
+      clock_(clock),
+      figures_(figures),
+      check_(settings) {}
+
+Reply PostHandler::refuse(Refusal refusal, const char* text) const {
+  figures_.refuse(refusal);
+  Reply reply = textReply(options_.refuseWith, std::string(text) + "\n");
+  reply.headers.push_back({"Retry-After", kRetryAfter});
+  return reply;
+}
+
+Reply PostHandler::reject(const Request& request, const Rejection& rejection) const {
+  if (rejection.refusal == Refusal::bodiesFull) return refuse(rejection.refusal, rejection.text.c_str());
+  figures_.refuse(rejection.refusal);
+  if (isDeadLetter(rejection.refusal)) deadLetters_.send(request, rejection);
+  Reply reply = textReply(rejection.status, rejection.text + "\n");
+  if (rejection.refusal == Refusal::wrongMethod) reply.headers.push_back({"Allow", "POST"});
+  return reply;
+}
+
+std::optional<Reply> PostHandler::refusal(const Request& request) const {
+  const std::optional<Rejection> rejection = check_.rejectionByHeaders(request);
+  if (!rejection) return std::nullopt;
+  return reject(request, *rejection);
+}
+
+uint64_t PostHandler::bodyLimit(const Request& /*request*/) const {
+  return std::min(settings_.maxBodyBytes, log_.maxBodyBytes());
+}
+
+Reply PostHandler::replyFor(Fate fate, uint64_t bytes, bool hasDigest) const {
+  switch (fate) {
+    case Fate::stored:
+    case Fate::spooled:
+      count(fate == Fate::stored ? figures_.stored : figures_.spooled);
+      count(figures_.bodyBytes, bytes);
+      count(hasDigest ? figures_.digestsValid : figures_.digestsAbsent);
+      return {};
+    case Fate::spoolFull:
+      return refuse(Refusal::spoolFull, "neither log nor spool has room");
+    case Fate::spoolBroken:
+      return refuse(Refusal::spoolBroken, "neither log nor spool can be written to");
+    case Fate::tooLargeForLog:
+      figures_.refuse(Refusal::tooLargeForLog);
+      return textReply(413, "the log takes no body of that size\n");
+  }
+  return {};
+}
+
+Answer PostHandler::answer(Request& request) {
+  bool hasDigest = false;
+  if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
+  if (isClosed_) return refuse(Refusal::stopping, "this receiver is about to end");
+  const TimeValue now = clock_.timeOfDay();
+  auto message = std::make_shared<LogMessage>();
+  message->id = messageID(request.body);
+  message->headers = factsOf(request, message->id, now.seconds * 1000 + now.microseconds / 1000, hasDigest);
+  message->body = std::move(request.body);
+  auto later = std::make_shared<http::LaterReply>();
+  const uint64_t bytes = message->body.size();
+  ++waiting_;
+  delivery_.take(std::move(message), [this, later, bytes, hasDigest](Fate fate) {
+    later->give(replyFor(fate, bytes, hasDigest));
+    --waiting_;
+  });
+  return later;
+}
+
+void PostHandler::broken(Request& request) {
+  figures_.refuse(request.tooSlow ? Refusal::tooSlow : Refusal::cutOff);
+}
+
+}  // namespace kyt::receiver

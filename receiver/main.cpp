@@ -1,0 +1,107 @@
+// kytreceiver: takes a fleet's posts of events and puts them into a distributed log.
+#include <sys/resource.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <variant>
+
+#include "platform/base/Counters.h"
+#include "platform/linux/base/StopSignals.h"
+#include "platform/linux/cli/CommandLine.h"
+#include "platform/linux/service/LogSinks.h"
+#include "receiver/Receiver.h"
+#include "receiver/nats/NatsLog.h"
+
+namespace kyt::receiver {
+namespace {
+
+struct Arguments {
+  std::string config = "/etc/kytreceiver/kytreceiver.toml";
+  std::string level = "default";
+  std::string readyFile;
+  int refuseWith = 429;
+  bool checkConfig = false, makeStreams = false;
+};
+
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+  limit.rlim_cur = limit.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+// Where the service manager connected standard error with the journal, the lines go there with their fields.
+LogTarget logTarget() {
+  return std::getenv("JOURNAL_STREAM") != nullptr ? LogTarget::automatic : LogTarget::standardError;
+}
+
+int fail(const std::string& text) {
+  std::fprintf(stderr, "kytreceiver: %s\n", text.c_str());
+  return 1;
+}
+
+int makeStreams(const Settings& settings, Log& lines) {
+  NatsLog log(settings.log, lines);
+  if (const auto wrong = log.makeStreams()) return fail(*wrong);
+  std::printf("The streams \"%s\" and \"kyt-dead-letters\" are there.\n", settings.log.stream.c_str());
+  return 0;
+}
+
+int run(const Settings& settings, const Arguments& arguments) {
+  StopSignals signals;
+  if (signals.error() != 0) return fail(std::strerror(signals.error()));
+  raiseDescriptorLimit();
+  Counters counters;
+  const std::unique_ptr<LogSink> sink = makeLogSink(logTarget(), counters, "kytreceiver");
+  sink->allowThreads();
+  Log lines(*sink, arguments.level == "debug"   ? LogLevel::debug
+                   : arguments.level == "error" ? LogLevel::error
+                                                : LogLevel::normal);
+  if (settings.log.kind == LogKind::kafka) return fail("[log] kind = \"kafka\" is not built in yet");
+  if (arguments.makeStreams) return makeStreams(settings, lines);
+  NatsLog log(settings.log, lines);
+  ReceiverOptions options;
+  options.posts.refuseWith = static_cast<unsigned>(arguments.refuseWith);
+  options.readyFile = arguments.readyFile;
+  return runReceiver(settings, options, log, signals, lines);
+}
+
+}  // namespace
+}  // namespace kyt::receiver
+
+int main(int argc, char** argv) {
+  using namespace kyt::receiver;
+  Arguments arguments;
+  const kyt::CommandLine commandLine(
+      "kytreceiver", "Takes a fleet's posts of events, checks them, and puts them into a replicated log");
+  commandLine.option("--config", arguments.config, "The settings").showsDefault();
+  commandLine.flag("--check-config", arguments.checkConfig, "Say what is wrong with the settings, and end");
+  commandLine.flag("--make-streams", arguments.makeStreams,
+                   "Make the streams that are missing in the log, and end");
+  commandLine
+      .option("--refuse-with", arguments.refuseWith,
+              "What a post gets that neither log nor spool can take; 503 switches devices off")
+      .between(429, 503)
+      .showsDefault();
+  commandLine.option("--log-level", arguments.level, "From which level on lines are logged")
+      .oneOf({"debug", "default", "error"})
+      .showsDefault();
+  commandLine.option("--ready-file", arguments.readyFile,
+                     "Written when the ports are open: their numbers as JSON");
+  if (const auto status = commandLine.parse(argc, argv)) return *status;
+  if (arguments.refuseWith != 429 && arguments.refuseWith != 503) {
+    std::fprintf(stderr, "kytreceiver: --refuse-with takes 429 or 503\n");
+    return kyt::kWrongUsage;
+  }
+  const auto settings = readSettings(arguments.config);
+  if (const auto* errors = std::get_if<SettingsErrors>(&settings)) {
+    for (const std::string& line : errors->lines) std::fprintf(stderr, "kytreceiver: %s\n", line.c_str());
+    return 1;
+  }
+  if (arguments.checkConfig) return 0;
+  return run(std::get<Settings>(settings), arguments);
+}

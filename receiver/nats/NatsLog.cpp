@@ -1,0 +1,339 @@
+#include "receiver/nats/NatsLog.h"
+
+#include <algorithm>
+#include <charconv>
+#include <chrono>
+#include <utility>
+#include <vector>
+
+#include "platform/base/TextEscape.h"
+#include "platform/linux/base/Threads.h"
+
+namespace kyt::receiver {
+namespace {
+
+constexpr char kDeadSubject[] = "kyt.dead", kDeadStream[] = "kyt-dead-letters";
+constexpr int64_t kConnectMilliseconds = 2000;
+constexpr int64_t kReconnectMilliseconds = 250;
+// A write that the server does not take ends the connection, and another server is tried.
+constexpr int64_t kWriteMilliseconds = 1500;
+constexpr std::chrono::milliseconds kAskAgain(500);
+constexpr std::chrono::seconds kEndTime(5);
+// Of a message's size, for its headers.
+constexpr int64_t kHeaderRoom = 8192;
+constexpr int64_t kDeadBytes = int64_t{1} << 30;
+constexpr int64_t kDuplicateWindow = int64_t{600} * 1000 * 1000 * 1000;  // nanoseconds
+
+std::string textOf(natsStatus status) {
+  return natsStatus_GetText(status);
+}
+
+std::string eventSubject(const std::string& partition) {
+  return "kyt.events." + partition;
+}
+
+// What stands behind a key of the stream's short answers, up to the comma or brace that ends it; empty: nothing. Only for
+// texts for people.
+std::string_view memberOf(std::string_view json, std::string_view key) {
+  const size_t at = json.find(key);
+  if (at == std::string_view::npos) return {};
+  json.remove_prefix(at + key.size());
+  json.remove_prefix(std::min(json.find_first_not_of(' '), json.size()));
+  if (!json.empty() && json.front() == '"') {
+    json.remove_prefix(1);
+    return json.substr(0, json.find('"'));
+  }
+  return json.substr(0, json.find_first_of(",}"));
+}
+
+std::string_view dataOf(natsMsg* message) {
+  return {natsMsg_GetData(message), static_cast<size_t>(natsMsg_GetDataLength(message))};
+}
+
+}  // namespace
+
+NatsLog::NatsLog(const LogSettings& settings, Log& lines) : settings_(settings), lines_(lines) {}
+
+NatsLog::~NatsLog() {
+  NatsLog::stop();
+}
+
+natsStatus NatsLog::makeOptions(Owned<natsOptions>& options) {
+  natsOptions* made = nullptr;
+  if (const natsStatus status = natsOptions_Create(&made); status != NATS_OK) return status;
+  options.reset(made);
+  std::vector<const char*> servers;
+  for (const std::string& server : settings_.servers) servers.push_back(server.c_str());
+  natsStatus status = natsOptions_SetServers(made, servers.data(), static_cast<int>(servers.size()));
+  const auto then = [&](natsStatus next) { status = status == NATS_OK ? next : status; };
+  then(natsOptions_SetName(made, "kytreceiver"));
+  then(natsOptions_SetTimeout(made, kConnectMilliseconds));
+  then(natsOptions_SetMaxReconnect(made, -1));
+  then(natsOptions_SetReconnectWait(made, kReconnectMilliseconds));
+  then(natsOptions_SetReconnectJitter(made, kReconnectMilliseconds, kReconnectMilliseconds));
+  then(natsOptions_SetPingInterval(made, 1000));
+  then(natsOptions_SetMaxPingsOut(made, 2));
+  then(natsOptions_SetWriteDeadline(made, kWriteMilliseconds));
+  then(natsOptions_SetDisconnectedCB(made, &NatsLog::onDown, this));
+  then(natsOptions_SetReconnectedCB(made, &NatsLog::onUp, this));
+  then(natsOptions_SetClosedCB(made, &NatsLog::onClosed, this));
+  if (!settings_.caFile.empty()) {
+    then(natsOptions_SetSecure(made, true));
+    then(natsOptions_LoadCATrustedCertificates(made, settings_.caFile.c_str()));
+  }
+  if (!settings_.credentials.empty())
+    then(natsOptions_SetUserCredentialsFromFiles(made, settings_.credentials.c_str(), nullptr));
+  return status;
+}
+
+void NatsLog::start(LogListener& listener) {
+  listener_ = &listener;
+  thread_ = std::thread([this] { run(); });
+}
+
+void NatsLog::publish(uint64_t token, std::shared_ptr<const LogMessage> message) {
+  MutexLock lock(mutex_);
+  queue_.push_back({token, std::move(message)});
+  if (queue_.size() == 1) changed_.notifyAll();
+}
+
+void NatsLog::publishDeadLetter(std::shared_ptr<const LogMessage> message) {
+  if (isConnected_) publish(0, std::move(message));
+}
+
+void NatsLog::stop() {
+  {
+    MutexLock lock(mutex_);
+    if (isStopping_) return;
+    isStopping_ = true;
+    changed_.notifyAll();
+  }
+  if (thread_.joinable()) thread_.join();
+  {
+    MutexLock lock(upMutex_);
+    isEnding_ = true;
+  }
+  if (subscription_) natsSubscription_Unsubscribe(subscription_.get());
+  if (connection_) natsConnection_Close(connection_.get());
+  {
+    const MonotonicTime deadline = std::chrono::steady_clock::now() + kEndTime;
+    MutexLock lock(mutex_);
+    while (!(ended_.connection && ended_.subscription) && changed_.waitUntil(mutex_, deadline)) {
+    }
+  }
+  subscription_.reset();
+  connection_.reset();
+}
+
+bool NatsLog::isStopping() {
+  MutexLock lock(mutex_);
+  return isStopping_;
+}
+
+void NatsLog::run() {
+  beginServiceThread("kyt-publish");
+  while (!isStopping() && !connect()) {
+    MutexLock lock(mutex_);
+    if (!isStopping_) changed_.waitUntil(mutex_, std::chrono::steady_clock::now() + kAskAgain);
+  }
+  while (!isStopping()) {
+    if (isConnected_ && !hasStream_) askForStream();
+    for (const Item& item : takeItems()) write(item);
+  }
+}
+
+// Waits for some.
+std::deque<NatsLog::Item> NatsLog::takeItems() {
+  const MonotonicTime deadline = std::chrono::steady_clock::now() + kAskAgain;
+  MutexLock lock(mutex_);
+  while (queue_.empty() && !isStopping_ && changed_.waitUntil(mutex_, deadline)) {
+  }
+  return std::exchange(queue_, {});
+}
+
+bool NatsLog::connect() {
+  Owned<natsOptions> options;
+  natsConnection* connection = nullptr;
+  natsSubscription* subscription = nullptr;
+  natsInbox* inbox = nullptr;
+  natsStatus status = makeOptions(options);
+  if (status == NATS_OK) status = natsConnection_Connect(&connection, options.get());
+  connection_.reset(connection);
+  if (status == NATS_OK) {
+    MutexLock lock(mutex_);
+    ended_.connection = false;
+  }
+  if (status == NATS_OK) status = natsInbox_Create(&inbox);
+  const Owned<natsInbox> ownedInbox(inbox);
+  if (status == NATS_OK) {
+    inbox_ = std::string(inbox) + ".";
+    status = natsConnection_Subscribe(&subscription, connection, (inbox_ + "*").c_str(), &NatsLog::onMessage,
+                                      this);
+    subscription_.reset(subscription);
+  }
+  if (status == NATS_OK) status = natsSubscription_SetPendingLimits(subscription, -1, -1);
+  if (status == NATS_OK) {
+    {
+      MutexLock lock(mutex_);
+      ended_.subscription = false;
+    }
+    status = natsSubscription_SetOnCompleteCB(subscription, &NatsLog::onLastMessage, this);
+  }
+  if (status != NATS_OK) {
+    const std::string text = textOf(status);
+    if (std::exchange(toldProblem_, text) != text)
+      lines_.error("log: cannot connect to its servers: %s", text.c_str());
+    return false;
+  }
+  noteConnected(connection);
+  return true;
+}
+
+void NatsLog::noteConnected(natsConnection* connection) {
+  const int64_t payload = natsConnection_GetMaxPayload(connection);
+  maxBodyBytes_ = payload > kHeaderRoom ? static_cast<uint64_t>(payload - kHeaderRoom) : 0;
+  char url[256] = "";
+  natsConnection_GetConnectedUrl(connection, url, sizeof url);
+  lines_.normal("log: connected to %s, which takes messages of %lld bytes", escapedText(url).c_str(),
+                static_cast<long long>(payload));
+  hasStream_ = false;
+  isConnected_ = true;
+}
+
+void NatsLog::onUp(natsConnection* connection, void* self) {
+  auto& log = *static_cast<NatsLog*>(self);
+  log.noteConnected(connection);
+  MutexLock lock(log.mutex_);
+  log.changed_.notifyAll();
+}
+
+void NatsLog::onDown(natsConnection* /*connection*/, void* self) {
+  auto& log = *static_cast<NatsLog*>(self);
+  log.isConnected_ = false;
+  log.hasStream_ = false;
+  log.setUp(false);
+}
+
+void NatsLog::onClosed(natsConnection* /*connection*/, void* self) {
+  auto& log = *static_cast<NatsLog*>(self);
+  MutexLock lock(log.mutex_);
+  log.ended_.connection = true;
+  log.changed_.notifyAll();
+}
+
+void NatsLog::onLastMessage(void* self) {
+  auto& log = *static_cast<NatsLog*>(self);
+  MutexLock lock(log.mutex_);
+  log.ended_.subscription = true;
+  log.changed_.notifyAll();
+}
+
+void NatsLog::setUp(bool isUp) {
+  MutexLock lock(upMutex_);
+  if (!isEnding_ && std::exchange(isUp_, isUp) != isUp) listener_->logIsUp(isUp);
+}
+
+// Which stream takes the events' subject: none as long as nobody has made it, or it has no leader.
+void NatsLog::askForStream() {
+  const std::string request = R"({"subject":")" + eventSubject("0") + R"("})";
+  static_cast<void>(natsConnection_PublishRequest(connection_.get(), "$JS.API.STREAM.NAMES",
+                                                  (inbox_ + "names").c_str(), request.data(),
+                                                  static_cast<int>(request.size())));
+}
+
+void NatsLog::takeStreamNames(std::string_view json) {
+  // A stream of that name, or several, each for some partitions, whose names begin with it.
+  if (json.find("[\"" + settings_.stream) != std::string_view::npos) {
+    isMissingTold_ = false;
+    hasStream_ = true;
+    return setUp(true);
+  }
+  if (!isMissingTold_.exchange(true))
+    lines_.error("log: no stream \"%s\" takes \"%s\"; kytreceiver --make-streams makes it",
+                 settings_.stream.c_str(), eventSubject("0").c_str());
+}
+
+void NatsLog::onMessage(natsConnection* /*connection*/, natsSubscription* /*subscription*/, natsMsg* message,
+                        void* self) {
+  auto& log = *static_cast<NatsLog*>(self);
+  const Owned<natsMsg> owned(message);
+  std::string_view name = natsMsg_GetSubject(message);
+  if (name.size() <= log.inbox_.size()) return;
+  name.remove_prefix(log.inbox_.size());
+  if (name == "names") return log.takeStreamNames(dataOf(message));
+  uint64_t token = 0;
+  const auto [end, error] = std::from_chars(name.data(), name.data() + name.size(), token);
+  if (error == std::errc() && end == name.data() + name.size()) log.takeAcknowledgement(token, message);
+}
+
+void NatsLog::takeAcknowledgement(uint64_t token, natsMsg* message) {
+  if (natsMsg_IsNoResponders(message))
+    return listener_->logAnswered(token, {LogVerdict::refused, "no stream takes the message"});
+  const std::string_view json = dataOf(message);
+  if (json.find("\"error\"") != std::string_view::npos) {
+    const std::string_view code = memberOf(json, "\"err_code\":");
+    const std::string_view text = memberOf(json, "\"description\":");
+    constexpr std::string_view kTooLarge = "10054";
+    const LogVerdict verdict = code == kTooLarge ? LogVerdict::refusedForGood : LogVerdict::refused;
+    return listener_->logAnswered(token, {verdict, escapedText(text) + " (" + escapedText(code) + ")"});
+  }
+  if (!memberOf(json, "\"stream\":").starts_with(settings_.stream))
+    return listener_->logAnswered(token, {LogVerdict::refused, "another stream took the message"});
+  const bool isDuplicate = memberOf(json, "\"duplicate\":") == "true";
+  listener_->logAnswered(token, {isDuplicate ? LogVerdict::duplicate : LogVerdict::stored, {}});
+}
+
+natsStatus NatsLog::publish(const Item& item) {
+  const LogMessage& content = *item.message;
+  const bool isDead = item.token == 0;
+  const std::string subject =
+      isDead ? kDeadSubject : eventSubject(std::to_string(partitionOf(content.id, settings_.partitions)));
+  const std::string reply = isDead ? std::string() : inbox_ + std::to_string(item.token);
+  natsMsg* message = nullptr;
+  natsStatus status = natsMsg_Create(&message, subject.c_str(), isDead ? nullptr : reply.c_str(),
+                                     content.body.data(), static_cast<int>(content.body.size()));
+  const Owned<natsMsg> owned(message);
+  if (status == NATS_OK && !isDead) status = natsMsgHeader_Set(message, "Nats-Msg-Id", content.id.c_str());
+  for (const auto& [name, value] : content.headers)
+    if (status == NATS_OK) status = natsMsgHeader_Set(message, name.c_str(), value.c_str());
+  return status == NATS_OK ? natsConnection_PublishMsg(connection_.get(), message) : status;
+}
+
+void NatsLog::write(const Item& item) {
+  // The library would keep it for when it is connected again; the spool does that better.
+  const natsStatus status = isConnected_ ? publish(item) : NATS_CONNECTION_DISCONNECTED;
+  if (status == NATS_OK || item.token == 0) return;
+  const auto verdict = status == NATS_MAX_PAYLOAD ? LogVerdict::refusedForGood : LogVerdict::refused;
+  listener_->logAnswered(item.token, {verdict, textOf(status)});
+}
+
+std::optional<std::string> NatsLog::makeStreams() {
+  if (!connect()) return "cannot connect: " + toldProblem_;
+  jsCtx* context = nullptr;
+  natsStatus status = natsConnection_JetStream(&context, connection_.get(), nullptr);
+  const Owned<jsCtx> owned(context);
+  if (status != NATS_OK) return textOf(status);
+  const auto make = [&](const char* name, const char* subject, int64_t maxBytes, jsDiscardPolicy discard) {
+    jsStreamConfig config;
+    jsStreamConfig_Init(&config);
+    config.Name = name;
+    config.Subjects = &subject;
+    config.SubjectsLen = 1;
+    config.Replicas = settings_.replicas;
+    config.MaxBytes = maxBytes;
+    config.Discard = discard;
+    config.Duplicates = kDuplicateWindow;
+    constexpr auto kNameInUse = static_cast<jsErrCode>(10058);
+    jsErrCode code{};
+    const natsStatus made = js_AddStream(nullptr, context, &config, nullptr, &code);
+    return made == NATS_OK || code == kNameInUse ? NATS_OK : made;
+  };
+  status = make(settings_.stream.c_str(), "kyt.events.*", settings_.maxBytes, js_DiscardNew);
+  if (status == NATS_OK) status = make(kDeadStream, kDeadSubject, kDeadBytes, js_DiscardOld);
+  if (status == NATS_OK) return std::nullopt;
+  std::string text = textOf(status);
+  if (const char* last = nats_GetLastError(nullptr); last != nullptr) text += std::string(": ") + last;
+  return text;
+}
+
+}  // namespace kyt::receiver

@@ -1,0 +1,107 @@
+// The log on NATS JetStream. A message is published on the subject kyt.events.PARTITION with its ID in "Nats-Msg-Id", by
+// which the stream knows repeats, and with a reply subject of its own below one inbox, where the stream's acknowledgement
+// arrives. Dead letters go to "kyt.dead".
+//
+// Threads: one of its own ("kyt-publish") writes, so that nobody waits for a server that does not read; the library's
+// deliver answers.
+#pragma once
+
+#include <nats/nats.h>
+
+#include <atomic>
+#include <deque>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <utility>
+
+#include "platform/base/ConditionVariable.h"
+#include "platform/base/Mutex.h"
+#include "platform/queues/Log.h"
+#include "receiver/EventLog.h"
+#include "receiver/Settings.h"
+
+namespace kyt::receiver {
+
+class NatsLog final : public EventLog {
+ public:
+  NatsLog(const LogSettings& settings, Log& lines);  // which outlive this
+  ~NatsLog() override;
+  NatsLog(const NatsLog&) = delete;
+  NatsLog& operator=(const NatsLog&) = delete;
+
+  void start(LogListener& listener) override;
+  void publish(uint64_t token, std::shared_ptr<const LogMessage> message) override EXCLUDES(mutex_);
+  void publishDeadLetter(std::shared_ptr<const LogMessage> message) override EXCLUDES(mutex_);
+  [[nodiscard]] uint64_t maxBodyBytes() const override { return maxBodyBytes_.load(); }
+  void stop() override EXCLUDES(mutex_);
+
+  // Makes the two streams, or says why that failed; nothing happens to one that is there. Blocks; without start().
+  [[nodiscard]] std::optional<std::string> makeStreams();
+
+ private:
+  struct Item {
+    uint64_t token = 0;  // 0: a dead letter
+    std::shared_ptr<const LogMessage> message;
+  };
+  struct Free {
+    void operator()(natsOptions* options) const { natsOptions_Destroy(options); }
+    void operator()(natsConnection* connection) const { natsConnection_Destroy(connection); }
+    void operator()(natsSubscription* subscription) const { natsSubscription_Destroy(subscription); }
+    void operator()(natsMsg* message) const { natsMsg_Destroy(message); }
+    void operator()(jsCtx* context) const { jsCtx_Destroy(context); }
+    void operator()(natsInbox* inbox) const { natsInbox_Destroy(inbox); }
+  };
+  template <typename T>
+  using Owned = std::unique_ptr<T, Free>;
+
+  // Which of the library's callbacks of this object may still come.
+  struct Ends {
+    bool subscription = true, connection = true;
+  };
+
+  [[nodiscard]] natsStatus makeOptions(Owned<natsOptions>& options);
+  static void onMessage(natsConnection* connection, natsSubscription* subscription, natsMsg* message,
+                        void* self);
+  static void onUp(natsConnection* connection, void* self);
+  static void onDown(natsConnection* connection, void* self);
+  static void onClosed(natsConnection* connection, void* self);
+  static void onLastMessage(void* self);
+  void run() EXCLUDES(mutex_);
+  [[nodiscard]] bool connect();
+  void noteConnected(natsConnection* connection);
+  [[nodiscard]] std::deque<Item> takeItems() EXCLUDES(mutex_);
+  [[nodiscard]] bool isStopping() EXCLUDES(mutex_);
+  void write(const Item& item);
+  [[nodiscard]] natsStatus publish(const Item& item);
+  void askForStream();
+  void takeStreamNames(std::string_view json);
+  void takeAcknowledgement(uint64_t token, natsMsg* message);
+  void setUp(bool isUp) EXCLUDES(upMutex_);
+
+  const LogSettings& settings_;
+  Log& lines_;
+  LogListener* listener_ = nullptr;
+  std::string inbox_;
+  Owned<natsConnection> connection_;
+  Owned<natsSubscription> subscription_;
+  std::atomic<uint64_t> maxBodyBytes_{~uint64_t{0}};
+  std::atomic<bool> isConnected_{false}, hasStream_{false};
+  std::string toldProblem_;  // of connecting, told last; the thread's alone
+  std::atomic<bool> isMissingTold_{false};
+  std::thread thread_;
+
+  Mutex upMutex_;  // held while the listener is told, so that it is told in order
+  bool isUp_ GUARDED_BY(upMutex_) = false;
+  bool isEnding_ GUARDED_BY(upMutex_) = false;
+
+  Mutex mutex_;
+  ConditionVariable changed_;
+  std::deque<Item> queue_ GUARDED_BY(mutex_);
+  Ends ended_ GUARDED_BY(mutex_);
+  bool isStopping_ GUARDED_BY(mutex_) = false;
+};
+
+}  // namespace kyt::receiver

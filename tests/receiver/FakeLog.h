@@ -1,0 +1,73 @@
+// A log in memory, which stores, refuses or is silent as the test says. Any thread.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/base/Mutex.h"
+#include "receiver/EventLog.h"
+
+namespace kyt::receiver {
+
+class FakeLog final : public EventLog {
+ public:
+  enum class Mood { stores, refuses, refusesForGood, isSilent };
+
+  void start(LogListener& listener) override { listener_ = &listener; }
+  void publish(uint64_t token, std::shared_ptr<const LogMessage> message) override {
+    LogAnswer answer;
+    {
+      MutexLock lock(mutex_);
+      published_.emplace_back(token, message->id);
+      switch (mood_.load()) {
+        case Mood::stores:
+          answer.verdict = ++stored_[message->id] > 1 ? LogVerdict::duplicate : LogVerdict::stored;
+          break;
+        case Mood::refuses:
+          answer = {LogVerdict::refused, "full"};
+          break;
+        case Mood::refusesForGood:
+          answer = {LogVerdict::refusedForGood, "too large"};
+          break;
+        case Mood::isSilent:
+          return;
+      }
+    }
+    listener_->logAnswered(token, answer);
+  }
+  void publishDeadLetter(std::shared_ptr<const LogMessage> message) override {
+    MutexLock lock(mutex_);
+    deadLetters_.push_back(std::move(message));
+  }
+  [[nodiscard]] uint64_t maxBodyBytes() const override { return ~uint64_t{0}; }
+  void stop() override {}
+
+  void setMood(Mood mood) { mood_ = mood; }
+  [[nodiscard]] std::vector<std::pair<uint64_t, std::string>> published() {
+    MutexLock lock(mutex_);
+    return published_;
+  }
+  [[nodiscard]] std::map<std::string, int> stored() {
+    MutexLock lock(mutex_);
+    return stored_;
+  }
+  [[nodiscard]] std::vector<std::shared_ptr<const LogMessage>> deadLetters() {
+    MutexLock lock(mutex_);
+    return deadLetters_;
+  }
+
+ private:
+  LogListener* listener_ = nullptr;
+  std::atomic<Mood> mood_{Mood::stores};
+  Mutex mutex_;
+  std::vector<std::pair<uint64_t, std::string>> published_ GUARDED_BY(mutex_);  // token, ID; in their order
+  std::map<std::string, int> stored_ GUARDED_BY(mutex_);                        // how often
+  std::vector<std::shared_ptr<const LogMessage>> deadLetters_ GUARDED_BY(mutex_);
+};
+
+}  // namespace kyt::receiver

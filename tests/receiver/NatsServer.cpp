@@ -1,0 +1,157 @@
+#include "tests/receiver/NatsServer.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <stdexcept>
+#include <thread>
+#include <utility>
+
+#include "tests/support/Eventually.h"
+
+namespace kyt::receiver {
+namespace {
+
+constexpr char kProgram[] = "/usr/sbin/nats-server";
+
+}  // namespace
+
+uint16_t freePort() {
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t size = sizeof address;
+  const int descriptor = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const bool isKnown = ::bind(descriptor, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0 &&
+                       ::getsockname(descriptor, reinterpret_cast<sockaddr*>(&address), &size) == 0;
+  ::close(descriptor);
+  return isKnown ? ntohs(address.sin_port) : 0;
+}
+
+bool NatsServers::isInstalled() {
+  return ::access(kProgram, X_OK) == 0;
+}
+
+NatsServers::NatsServers(Options options) {
+  for (size_t i = 0; i < options.servers; ++i) {
+    ports_.push_back(freePort());
+    routePorts_.push_back(freePort());
+  }
+  for (size_t i = 0; i < options.servers; ++i) {
+    std::string text = "server_name: " + name(i) + "\nlisten: \"127.0.0.1:" + std::to_string(ports_[i]) +
+                       "\"\nmax_payload: 20MB\nmax_pending: 80MB\njetstream { store_dir: \"" +
+                       folder_.path() + "/" + name(i) + "\", max_mem: 64MB, max_file: 2GB }\n" +
+                       options.more + "\n";
+    if (options.servers > 1) {
+      text += "cluster { name: test, listen: \"127.0.0.1:" + std::to_string(routePorts_[i]) + "\", routes: [";
+      for (const uint16_t port : routePorts_) text += " \"nats://127.0.0.1:" + std::to_string(port) + "\"";
+      text += " ] }\n";
+    }
+    folder_.write(name(i) + ".conf", text);
+  }
+  processes_.resize(options.servers);
+}
+
+void NatsServers::start(size_t index) {
+  tools::ChildProcess::Options how;
+  how.outputFile = folder_ / (name(index) + ".log");
+  auto started = tools::ChildProcess::start(kProgram, {"-c", folder_ / (name(index) + ".conf")}, how);
+  if (!started) throw std::runtime_error(std::string(kProgram) + " cannot be started");
+  processes_[index] = std::move(*started);
+}
+
+void NatsServers::start() {
+  for (size_t i = 0; i < size(); ++i) start(i);
+}
+
+void NatsServers::kill(size_t index) {
+  processes_[index].signal(SIGKILL);
+  static_cast<void>(processes_[index].wait(kTestDeadline));
+}
+
+std::string NatsServers::url(size_t index) const {
+  return "nats://127.0.0.1:" + std::to_string(ports_[index]);
+}
+
+std::string NatsServers::urlsAsToml() const {
+  std::string text;
+  for (size_t i = 0; i < size(); ++i) text += (i == 0 ? "[\"" : ", \"") + url(i) + "\"";
+  return text + "]";
+}
+
+StreamView::StreamView(const std::string& url) {
+  const bool isConnected = eventually([&] {
+    if (natsConnection_ConnectTo(&connection_, url.c_str()) == NATS_OK) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    return false;
+  });
+  if (!isConnected || natsConnection_JetStream(&context_, connection_, nullptr) != NATS_OK)
+    throw std::runtime_error("cannot connect to " + url);
+}
+
+StreamView::~StreamView() {
+  jsCtx_Destroy(context_);
+  natsConnection_Destroy(connection_);
+}
+
+std::optional<uint64_t> StreamView::messages(const char* stream) {
+  jsStreamInfo* info = nullptr;
+  if (js_GetStreamInfo(&info, context_, stream, nullptr, nullptr) != NATS_OK) return std::nullopt;
+  const uint64_t count = info->State.Msgs;
+  jsStreamInfo_Destroy(info);
+  return count;
+}
+
+std::string StreamView::leader(const char* stream) {
+  jsStreamInfo* info = nullptr;
+  if (js_GetStreamInfo(&info, context_, stream, nullptr, nullptr) != NATS_OK) return {};
+  std::string name =
+      info->Cluster != nullptr && info->Cluster->Leader != nullptr ? info->Cluster->Leader : "";
+  jsStreamInfo_Destroy(info);
+  return name;
+}
+
+bool StreamView::purge(const char* stream) {
+  return js_PurgeStream(context_, stream, nullptr, nullptr) == NATS_OK;
+}
+
+bool StreamView::setMaxBytes(int64_t bytes) {
+  jsStreamInfo* info = nullptr;
+  if (js_GetStreamInfo(&info, context_, "kyt-events", nullptr, nullptr) != NATS_OK) return false;
+  info->Config->MaxBytes = bytes;
+  const bool isDone = js_UpdateStream(nullptr, context_, info->Config, nullptr, nullptr) == NATS_OK;
+  jsStreamInfo_Destroy(info);
+  return isDone;
+}
+
+std::optional<StoredMessage> StreamView::message(uint64_t number, const char* stream) {
+  natsMsg* message = nullptr;
+  if (js_GetMsg(&message, context_, stream, number, nullptr, nullptr) != NATS_OK) return std::nullopt;
+  StoredMessage stored;
+  stored.subject = natsMsg_GetSubject(message);
+  stored.body.assign(natsMsg_GetData(message), static_cast<size_t>(natsMsg_GetDataLength(message)));
+  const char** names = nullptr;
+  int count = 0;
+  if (natsMsgHeader_Keys(message, &names, &count) == NATS_OK) {
+    for (int i = 0; i < count; ++i) {
+      const char* value = nullptr;
+      if (natsMsgHeader_Get(message, names[i], &value) == NATS_OK) stored.headers[names[i]] = value;
+    }
+    std::free(names);  // NOLINT(cppcoreguidelines-no-malloc): the library's
+  }
+  natsMsg_Destroy(message);
+  return stored;
+}
+
+std::map<std::string, int> StreamView::ids() {
+  std::map<std::string, int> found;
+  const uint64_t count = messages().value_or(0);
+  for (uint64_t i = 1; i <= count; ++i)
+    if (const auto stored = message(i)) ++found[stored->headers.at("Kyt-Id")];
+  return found;
+}
+
+}  // namespace kyt::receiver

@@ -1,0 +1,214 @@
+// The program with a real server of the log.
+#include <gtest/gtest.h>
+
+#include "http/PostDigest.h"
+#include "tests/receiver/NatsServer.h"
+#include "tests/receiver/ReceiverProcess.h"
+#include "tests/support/Eventually.h"
+
+namespace kyt::receiver {
+namespace {
+
+constexpr char kKeys[] =
+    "digest = \"required\"\ndigest_keys = { \"QPW/videocall\" = [\"6f6c64\", \"6e6577\"] }\n";
+
+class ReceiverTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!NatsServers::isInstalled()) GTEST_SKIP() << "nats-server is not installed";
+    servers_.start();
+    view_.emplace(servers_.url(0));
+  }
+  // With its streams; ready for posts.
+  void start(ReceiverProcess::Options options = {}) {
+    options.servers = servers_.urlsAsToml();
+    if (!receiver_) receiver_.emplace(options);
+    ASSERT_TRUE(receiver_->isReady()) << receiver_->output();
+    makeStreams();
+    ASSERT_TRUE(receiver_->becomesReady()) << receiver_->output();
+  }
+  void makeStreams() const {
+    ASSERT_TRUE(eventually([&] {
+      auto made = tools::ChildProcess::start(KYT_RECEIVER,
+                                             {"--config", receiver_->configFile(), "--make-streams"}, {});
+      return made && made->wait(kTestDeadline) == 0;
+    }));
+  }
+
+  NatsServers servers_;
+  std::optional<StreamView> view_;
+  std::optional<ReceiverProcess> receiver_;
+};
+
+TEST_F(ReceiverTest, AnswersOnceTheLogHasThePostWithItsFacts) {
+  start();
+  const std::string body = gzipped(postText(1));
+  EXPECT_EQ(
+      receiver_
+          ->post(body, {"Content-Encoding: gzip", "X-KYT-Sender: QPW", "X-KYT-Client-Name: video\xc3\xa4",
+                        "X-KYT-Service-Name: calls", "X-KYT-Client-Version: 7"})
+          .status,
+      200);
+  ASSERT_EQ(view_->messages(), 1U);
+  auto stored = view_->message(1);
+  ASSERT_TRUE(stored);
+  EXPECT_EQ(stored->body, body);
+  EXPECT_EQ(stored->subject, "kyt.events.0");
+  EXPECT_EQ(stored->headers.at("Nats-Msg-Id"), stored->headers.at("Kyt-Id"));
+  EXPECT_EQ(stored->headers.at("Kyt-Id").size(), 64U);
+  EXPECT_GT(std::stoll(stored->headers.at("Kyt-Received")), 1700000000000LL);
+  stored->headers.erase("Nats-Msg-Id");
+  stored->headers.erase("Kyt-Id");
+  stored->headers.erase("Kyt-Received");
+  EXPECT_EQ(stored->headers, (std::map<std::string, std::string>{{"Kyt-Path", "/v1/events"},
+                                                                 {"Kyt-Sender", "QPW"},
+                                                                 {"Kyt-Client", "video\xc3\xa4"},
+                                                                 {"Kyt-Service", "calls"},
+                                                                 {"Kyt-Client-Version", "7"},
+                                                                 {"Kyt-Encoding", "gzip"},
+                                                                 {"Kyt-Digest", "absent"}}));
+}
+
+TEST_F(ReceiverTest, StoresARepeatOnce) {
+  start();
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->post(postText(2)).status, 200);
+  EXPECT_EQ(view_->messages(), 2U);
+  EXPECT_EQ(receiver_->metric("kyt_duplicates_total"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_posts_total{result=\"stored\"}"), 3);
+}
+
+TEST_F(ReceiverTest, SpreadsPostsOverPartitions) {
+  ReceiverProcess::Options options;
+  options.log = "partitions = 4\n";
+  start(options);
+  std::map<std::string, int> subjects;
+  for (uint64_t i = 1; i <= 40; ++i) {
+    ASSERT_EQ(receiver_->post(postText(i)).status, 200);
+    ++subjects[view_->message(i)->subject];
+  }
+  EXPECT_EQ(subjects.size(), 4U);
+}
+
+TEST_F(ReceiverTest, ChecksTheDigestUnderEachKeyOfTheSender) {
+  ReceiverProcess::Options options;
+  options.path = kKeys;
+  start(options);
+  const std::string body = gzipped(postText(1));
+  const auto post = [&](const std::string& digest, const std::string& sender = "QPW") {
+    std::vector<std::string> headers = {"Content-Encoding: gzip", "X-KYT-Sender: " + sender,
+                                        "X-KYT-Client-Name: videocall"};
+    if (!digest.empty()) headers.push_back("X-KYT-DIGEST: " + digest);
+    return receiver_->post(body, headers).status;
+  };
+  EXPECT_EQ(post(http::digestText("new", body)), 200);
+  EXPECT_EQ(post(http::digestText("old", body)), 200);
+  EXPECT_EQ(view_->message(1)->headers.at("Kyt-Digest"), "valid");
+  EXPECT_EQ(post(http::digestText("other", body)), 400);
+  EXPECT_EQ(post(http::digestText("new", body + "x")), 400);
+  EXPECT_EQ(post(""), 400);
+  EXPECT_EQ(post(http::digestText("new", body), "QQQ"), 400);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"digest-wrong\"}"), 2);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"digest-missing\"}"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"digest-unknown-sender\"}"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_digest_total{verdict=\"valid\"}"), 2);
+  EXPECT_EQ(view_->messages(), 1U);
+}
+
+TEST_F(ReceiverTest, RefusesWhatCanNeverBeTakenAndKeepsACopyOfIt) {
+  start();
+  EXPECT_EQ(receiver_->post("no gzip", {"Content-Encoding: gzip"}).status, 400);
+  EXPECT_EQ(receiver_->post("").status, 400);
+  EXPECT_EQ(receiver_->post(postText(1), {"Content-Encoding: br"}).status, 415);
+  EXPECT_EQ(receiver_->post(std::string((17 << 20) + 1, 'x')).status, 413);
+  HttpConnection chunked(receiver_->port());
+  chunked.send(
+      "POST /v1/events HTTP/1.1\r\nHost: t\r\nTransfer-Encoding: chunked\r\n\r\n5\r\nhello\r\n0\r\n\r\n");
+  EXPECT_EQ(chunked.receive().status, 411);
+  HttpConnection lengthless(receiver_->port());
+  lengthless.send("POST /v1/events HTTP/1.1\r\nHost: t\r\n\r\n");
+  EXPECT_EQ(lengthless.receive().status, 411);
+  EXPECT_EQ(HttpConnection(receiver_->port()).post("/elsewhere", "{}").status, 404);
+  EXPECT_EQ(HttpConnection(receiver_->port()).get("/v1/events").status, 405);
+  EXPECT_EQ(view_->messages(), 0U);
+  EXPECT_TRUE(eventually([&] { return view_->messages("kyt-dead-letters") == 6U; }));
+  const auto letter = view_->message(1, "kyt-dead-letters");
+  ASSERT_TRUE(letter);
+  EXPECT_EQ(letter->subject, "kyt.dead");
+  EXPECT_EQ(letter->body, "no gzip");
+  EXPECT_EQ(letter->headers.at("Kyt-Reason"), "not-gzip");
+  EXPECT_EQ(letter->headers.at("Kyt-Bytes"), "7");
+  for (const char* reason :
+       {"not-gzip", "empty", "wrong-encoding", "too-large", "unknown-path", "wrong-method"})
+    EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"" + std::string(reason) + "\"}"), 1) << reason;
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"no-length\"}"), 2);
+}
+
+TEST_F(ReceiverTest, TakesAPostOfSeventeenMebibytes) {
+  start();
+  const std::string body((17 << 20) - 1000, 'x');
+  EXPECT_EQ(receiver_->post(body).status, 200);
+  EXPECT_EQ(view_->message(1)->body.size(), body.size());
+}
+
+TEST_F(ReceiverTest, IsAliveAtOnceAndReadyWhenTheLogIsThere) {
+  servers_.kill(0);
+  ReceiverProcess::Options options;
+  options.servers = servers_.urlsAsToml();
+  receiver_.emplace(options);
+  ASSERT_TRUE(receiver_->isReady()) << receiver_->output();
+  EXPECT_EQ(receiver_->get("/livez").status, 200);
+  EXPECT_EQ(receiver_->get("/readyz").status, 503);
+  EXPECT_EQ(receiver_->get("/elsewhere").status, 404);
+  // What comes all the same is kept.
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->metric("kyt_posts_total{result=\"spooled\"}"), 1);
+  servers_.start(0);
+  view_.emplace(servers_.url(0));
+  start();
+  EXPECT_TRUE(eventually([&] { return view_->messages() == 1U; }));
+}
+
+TEST_F(ReceiverTest, KeepsPostsWhileTheLogIsAwayAndStoresEachOnceAfterwards) {
+  start();
+  ASSERT_EQ(receiver_->post(postText(1)).status, 200);
+  servers_.kill(0);
+  for (uint64_t i = 2; i <= 20; ++i) {
+    const HttpReply reply = receiver_->post(postText(i));
+    EXPECT_EQ(reply.status, 200);
+    EXPECT_LT(reply.took, std::chrono::milliseconds(2500) * 4);
+  }
+  EXPECT_EQ(receiver_->get("/readyz").status, 200);
+  servers_.start(0);
+  view_.emplace(servers_.url(0));
+  EXPECT_TRUE(eventually([&] { return view_->messages().value_or(0) == 20U; })) << receiver_->output();
+  const auto ids = view_->ids();
+  EXPECT_EQ(ids.size(), 20U);
+  for (const auto& [id, times] : ids) EXPECT_EQ(times, 1) << id;
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_spool_posts") == 0; }));
+}
+
+TEST_F(ReceiverTest, EndsInOrderWithTheStatusZero) {
+  start();
+  HttpConnection idle(receiver_->port());
+  EXPECT_EQ(idle.post("/v1/events", postText(1)).status, 200);
+  EXPECT_EQ(receiver_->terminate(), 0) << receiver_->output();
+}
+
+TEST_F(ReceiverTest, SaysWhatIsWrongWithItsSettings) {
+  const TemporaryFolder folder;
+  const std::string file = folder.write("r.toml", "[log]\nkind = \"mqtt\"\n");
+  tools::ChildProcess::Options how;
+  how.outputFile = folder / "output";
+  auto check = tools::ChildProcess::start(KYT_RECEIVER, {"--config", file, "--check-config"}, how);
+  ASSERT_TRUE(check);
+  EXPECT_EQ(check->wait(kTestDeadline), 1);
+  EXPECT_NE(folder.read("output").find(file + ":2: \"log.kind\" must be"), std::string::npos);
+  auto wrong = tools::ChildProcess::start(KYT_RECEIVER, {"--refuse-with", "500"}, how);
+  ASSERT_TRUE(wrong);
+  EXPECT_EQ(wrong->wait(kTestDeadline), 2);
+}
+
+}  // namespace
+}  // namespace kyt::receiver
