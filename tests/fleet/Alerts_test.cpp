@@ -2,6 +2,9 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <regex>
 #include <string>
 
 #include "tests/support/Programs.h"
@@ -29,6 +32,28 @@ TEST_F(Alerts, AreRulesThatPrometheusTakes) {
 TEST_F(Alerts, SpeakUpInAnOutageAndAreSilentOtherwise) {
   const ProgramRun run = runProgram("promtool", {"test", "rules", folder_ / "alerts-test.yml"});
   EXPECT_EQ(run.status, 0) << run.text;
+}
+
+TEST_F(Alerts, AskForFiguresThatReceiversGive) {
+  const auto textOf = [](const std::string& path) {
+    std::ifstream file(path);
+    return std::string(std::istreambuf_iterator<char>(file), {});
+  };
+  const std::string rules = textOf(KYT_FLEET_FILES "/alerts.yml"),
+                    metrics = textOf(KYT_SOURCE_DIR "/receiver/Metrics.cpp"),
+                    reasons = textOf(KYT_SOURCE_DIR "/receiver/Figures.cpp");
+  int names = 0;
+  const std::regex figure("kyt_[a-z_]+");
+  for (std::sregex_iterator i(rules.begin(), rules.end(), figure), end; i != end; ++i, ++names) {
+    std::string name = i->str();
+    if (name.ends_with("_total")) name.resize(name.size() - 6);
+    EXPECT_NE(metrics.find("(\"" + name + "\""), std::string::npos) << name;
+  }
+  EXPECT_GE(names, 9);
+  for (const char* reason : {"spool-full", "spool-broken", "bodies-full"}) {
+    EXPECT_NE(rules.find(reason), std::string::npos);
+    EXPECT_NE(reasons.find(std::string("\"") + reason + "\""), std::string::npos) << reason;
+  }
 }
 
 }  // namespace

@@ -1,0 +1,225 @@
+// kytreader between a real NATS and a real PostgreSQL: each post once in the table, whatever comes twice, breaks or cannot be
+// read.
+#include <gtest/gtest.h>
+#include <nats/nats.h>
+#include <zlib.h>
+
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "tests/support/Eventually.h"
+#include "tests/support/Programs.h"
+#include "tests/support/TemporaryFolder.h"
+#include "tools/fleet/Front.h"
+#include "tools/fleet/Postgres.h"
+
+namespace kyt {
+namespace {
+
+std::string gzipped(const std::string& text) {
+  z_stream stream{};
+  deflateInit2(&stream, Z_BEST_SPEED, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY);
+  std::string out(deflateBound(&stream, text.size()) + 32, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+  stream.avail_in = static_cast<uInt>(text.size());
+  stream.next_out = reinterpret_cast<Bytef*>(out.data());
+  stream.avail_out = static_cast<uInt>(out.size());
+  deflate(&stream, Z_FINISH);
+  out.resize(stream.total_out);
+  deflateEnd(&stream);
+  return out;
+}
+
+// So many events, of a device.
+std::string message(int number, int events = 2) {
+  std::string text =
+      R"({"postTime":1769860800.25,"clientId":"device-)" + std::to_string(number) + R"(","events":[)";
+  for (int i = 0; i < events; ++i)
+    text += std::string(i == 0 ? "" : ",") + R"({"_eventNumber":)" + std::to_string(i) + R"(,"_method":10})";
+  return text + "]}";
+}
+
+// As a post is known by: 64 hexadecimal digits, here from a short name.
+std::string idOf(const std::string& name) {
+  std::string id;
+  for (const char c : name) {
+    char digits[3];
+    std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(c));
+    id += digits;
+  }
+  return id + std::string(64 - id.size(), '0');
+}
+
+class Reader : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!isInstalled("nats-server")) GTEST_SKIP() << "nats-server is not installed";
+    if (!tools::Postgres::isHere()) GTEST_SKIP() << "postgresql is not installed";
+    auto started = tools::Postgres::start();
+    ASSERT_TRUE(std::holds_alternative<std::unique_ptr<tools::Postgres>>(started))
+        << std::get<Error>(started).localizedDescription;
+    postgres_ = std::get<std::unique_ptr<tools::Postgres>>(std::move(started));
+    startLog();
+  }
+  void startLog() {
+    port_ = tools::freePort();
+    tools::ChildProcess::Options how;
+    how.outputFile = folder_ / "nats.log";
+    const std::string settings = folder_.write(
+        "nats.conf", "listen: \"127.0.0.1:" + std::to_string(port_) +
+                         "\"\nmax_payload: 20MB\njetstream { store_dir: \"" + folder_.path() + "/nats\" }\n");
+    auto started = tools::ChildProcess::start("/usr/sbin/nats-server", {"-c", settings}, how);
+    ASSERT_TRUE(started);
+    log_ = std::move(*started);
+    ASSERT_TRUE(eventually([this] { return tools::takesConnections(port_); })) << folder_.read("nats.log");
+    ASSERT_EQ(natsConnection_ConnectTo(&connection_, url().c_str()), NATS_OK);
+    ASSERT_EQ(natsConnection_JetStream(&context_, connection_, nullptr), NATS_OK);
+    jsStreamConfig stream;
+    jsStreamConfig_Init(&stream);
+    const char* subjects[] = {"kyt.events.*"};
+    stream.Name = "kyt-events";
+    stream.Subjects = subjects;
+    stream.SubjectsLen = 1;
+    ASSERT_TRUE(
+        eventually([&] { return js_AddStream(nullptr, context_, &stream, nullptr, nullptr) == NATS_OK; }));
+  }
+  void TearDown() override {
+    if (reader_.pid() > 0) {
+      EXPECT_EQ(end(), 0) << said();
+    }
+    jsCtx_Destroy(context_);
+    natsConnection_Destroy(connection_);
+  }
+  [[nodiscard]] std::string url() const { return "nats://127.0.0.1:" + std::to_string(port_); }
+  void startReader(std::vector<std::string> further = {}) {
+    std::vector<std::string> arguments = {"--server", url(), "--database", postgres_->database()};
+    arguments.insert(arguments.end(), further.begin(), further.end());
+    tools::ChildProcess::Options how;
+    how.outputFile = folder_ / "reader.log";
+    auto started = tools::ChildProcess::start(KYT_READER, arguments, how);
+    ASSERT_TRUE(started);
+    reader_ = std::move(*started);
+  }
+  std::optional<int> end() {
+    reader_.signal(SIGTERM);
+    const auto status = reader_.wait(std::chrono::seconds(30));
+    reader_ = tools::ChildProcess();
+    return status;
+  }
+  [[nodiscard]] std::string said() const { return folder_.read("reader.log"); }
+
+  // As the receiver publishes it.
+  void put(const std::string& name, const std::string& body, const std::string& encoding = "gzip") {
+    natsMsg* message = nullptr;
+    ASSERT_EQ(natsMsg_Create(&message, "kyt.events.0", nullptr, body.data(), static_cast<int>(body.size())),
+              NATS_OK);
+    for (const auto& [header, value] :
+         std::vector<std::pair<const char*, std::string>>{{"Kyt-Id", name.empty() ? "" : idOf(name)},
+                                                          {"Kyt-Received", "1769860800123"},
+                                                          {"Kyt-Path", "/v1/events"},
+                                                          {"Kyt-Sender", "QPW"},
+                                                          {"Kyt-Client", "person"},
+                                                          {"Kyt-Encoding", encoding},
+                                                          {"Kyt-Digest", "valid"}})
+      natsMsgHeader_Set(message, header, value.c_str());
+    EXPECT_EQ(js_PublishMsg(nullptr, context_, message, nullptr, nullptr), NATS_OK);
+    natsMsg_Destroy(message);
+  }
+  [[nodiscard]] bool holds(const std::string& sql, const std::string& answer) const {
+    std::string last;
+    const bool isSo = eventually([&] { return (last = postgres_->query(sql)) == answer + "\n"; });
+    EXPECT_TRUE(isSo) << sql << ": " << last << said();
+    return isSo;
+  }
+  // What the consumer has not acknowledged, or not been given.
+  [[nodiscard]] uint64_t unread() const {
+    jsConsumerInfo* info = nullptr;
+    if (js_GetConsumerInfo(&info, context_, "kyt-events", "kytreader", nullptr, nullptr) != NATS_OK) return 1;
+    const uint64_t count = info->NumPending + static_cast<uint64_t>(info->NumAckPending);
+    jsConsumerInfo_Destroy(info);
+    return count;
+  }
+
+  TemporaryFolder folder_;
+  std::unique_ptr<tools::Postgres> postgres_;
+  uint16_t port_ = 0;
+  tools::ChildProcess log_, reader_;
+  natsConnection* connection_ = nullptr;
+  jsCtx* context_ = nullptr;
+};
+
+TEST_F(Reader, StoresEachPostWithItsFactsAndItsEventsAsRows) {
+  startReader();
+  put("aa", gzipped(message(1)));
+  put("bb", message(2, 3), "identity");
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_events", "5"));
+  EXPECT_EQ(postgres_->query(
+                "SELECT received AT TIME ZONE 'UTC', path, sender, client, service, digest, client_id FROM "
+                "kyt_posts WHERE id = '" +
+                idOf("aa") + "'"),
+            "2026-01-31 12:00:00.123|/v1/events|QPW|person||valid|device-1\n");
+  EXPECT_EQ(postgres_->query("SELECT number, record FROM kyt_events WHERE post = '" + idOf("aa") +
+                             "' ORDER BY number"),
+            "1|{\"_method\": 10, \"_eventNumber\": 0}\n2|{\"_method\": 10, \"_eventNumber\": 1}\n");
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+}
+
+TEST_F(Reader, LeavesRepeatsOutByTheirID) {
+  startReader();
+  for (int i = 0; i < 3; ++i) put("aa", gzipped(message(1)));
+  put("bb", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "2"));
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+  EXPECT_EQ(postgres_->query("SELECT count(*) FROM kyt_events"), "4\n");
+  EXPECT_EQ(end(), 0);
+  EXPECT_NE(said().find("2 posts stored, 2 repeats left out"), std::string::npos) << said();
+}
+
+TEST_F(Reader, SetsAsideWhatCannotBeReadAndGoesOn) {
+  startReader({"--batch", "10"});
+  put("no-gzip", "no gzip");
+  put("good-1", gzipped(message(1)));
+  put("no-json", gzipped("{\"events\":["));
+  put("no-array", gzipped("{\"events\":7}"));
+  put("zero", gzipped(R"({"events":[{"a":"\u0000"}]})"));
+  put("bytes", gzipped("{\"events\":[{\"a\":\"\xff\"}]}"));
+  put("other", "text", "br");
+  put("", "who wrote this?");  // the library cannot read headers of which one is empty
+  put("good-2", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_unreadable", "7"));
+  EXPECT_TRUE(
+      holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_posts", idOf("good-1") + " " + idOf("good-2")));
+  EXPECT_EQ(postgres_->query("SELECT reason, body FROM kyt_unreadable WHERE id = '" + idOf("other") + "'"),
+            "unknown encoding \"br\"|\\x74657874\n");
+  EXPECT_EQ(
+      postgres_->query("SELECT reason, body FROM kyt_unreadable WHERE id LIKE 'message % of kyt-events'"),
+      "no Kyt-Id, or headers that cannot be read|\\x77686f2077726f746520746869733f\n");
+  EXPECT_TRUE(eventually([this] { return unread() == 0; })) << "nothing comes again for ever";
+}
+
+TEST_F(Reader, LosesAndDoublesNothingWhereItDiesOrTheDatabaseDoes) {
+  startReader({"--batch", "7", "--acknowledge-within", "2"});
+  constexpr int kPosts = 400;
+  for (int i = 0; i < kPosts; ++i) {
+    put("id-" + std::to_string(i), gzipped(message(i)));
+    if (i == 100 || i == 250) {
+      EXPECT_TRUE(
+          eventually([this] { return postgres_->query("SELECT count(*) > 20 FROM kyt_posts") == "t\n"; }));
+      reader_.signal(SIGKILL);
+      static_cast<void>(reader_.wait(std::chrono::seconds(30)));
+      startReader({"--batch", "7", "--acknowledge-within", "2"});
+    }
+    if (i == 180) {
+      const auto problem = postgres_->restart();
+      ASSERT_FALSE(problem) << problem->localizedDescription;
+    }
+  }
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", std::to_string(kPosts)));
+  EXPECT_EQ(postgres_->query("SELECT count(*), count(DISTINCT post) FROM kyt_events"), "800|400\n");
+}
+
+}  // namespace
+}  // namespace kyt
