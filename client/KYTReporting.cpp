@@ -103,6 +103,16 @@ bool KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payl
   return implementation_->session->enqueueMessage(category, type, std::move(payload), flag);
 }
 
+std::optional<Error> KYTReporting::trySendMessage(uint32_t category, uint32_t type, Dictionary payload,
+                                                  uint32_t flag) {
+  client::Session& session = *implementation_->session;
+  if (session.enqueueMessage(category, type, std::move(payload), flag)) return std::nullopt;
+  if (!inRange(category, type))
+    return client::clientError(ClientError::invalid, client::outOfRange(category, type));
+  if (session.refuses()) return session.refusal();
+  return client::clientError(ClientError::queueFull, "the queue is full");
+}
+
 void KYTReporting::sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                                ObjectCompletion completion) {
   Answer answer(std::move(completion));
@@ -180,6 +190,14 @@ std::string KYTReporting::stateReason() const {
 
 KYTReporting::Statistics KYTReporting::statistics() const {
   return implementation_->session->statistics();
+}
+
+void KYTReporting::close() {
+  implementation_->session->stop();
+}
+
+void KYTReporting::closeAll() {
+  client::Loop::current()->closeAll();
 }
 
 KYTReporting::Statistics KYTReporting::totalStatistics() {

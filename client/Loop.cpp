@@ -68,6 +68,15 @@ void Loop::add(const std::shared_ptr<Session>& session) {
   if (ran) wakeUp_.wake();
 }
 
+void Loop::closeAll() {
+  Sessions sessions;
+  {
+    MutexLock lock(mutex_);
+    sessions = sessions_;
+  }
+  for (const auto& session : sessions) session->stop();
+}
+
 void Loop::enroll(const Session& session) {
   MutexLock lock(mutex_);
   counted_.insert(&session);

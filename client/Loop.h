@@ -24,6 +24,8 @@ class Loop {
 
   // The session ends at once where the system gives no thread; others that have one, or get one, do not.
   void add(const std::shared_ptr<Session>& session);
+  // Closes each session; on the library's thread those end with the running completion.
+  void closeAll() EXCLUDES(mutex_);
   // A session's figures are part of the process's from its making to its end, and stay so. Any thread.
   void enroll(const Session& session) EXCLUDES(mutex_);
   void retire(const Session& session) EXCLUDES(mutex_);

@@ -137,18 +137,22 @@ bool Session::finishAndWait(milliseconds timeout) {
 }
 
 void Session::close() {
-  if (!inert_) {
-    closed_ = true;
-    if (loop_->isCurrentThread()) {
-      libraryThread.assertCurrent();
-      end(ClientError::closed, "the session was closed");
-      return;
-    }
-    loop_->wake();
-    waiters_.waitForEnd();
-  }
+  const bool within = !inert_ && loop_->isCurrentThread();
+  stop();
+  if (within) return;
   libraryThread.assertCurrent();  // nothing runs there for this session
   standing_.sayDrops(statistics());
+}
+
+void Session::stop() {
+  if (inert_) return;
+  closed_ = true;
+  if (loop_->isCurrentThread()) {
+    libraryThread.assertCurrent();
+    return end(ClientError::closed, "the session was closed");
+  }
+  loop_->wake();
+  waiters_.waitForEnd();
 }
 
 void Session::becomeInert() {

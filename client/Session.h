@@ -42,6 +42,12 @@ class Session {
   // Any thread.
   bool enqueueMessage(uint32_t category, uint32_t type, Dictionary&& payload, uint32_t flag);
   void enqueueCommand(std::unique_ptr<Command> command);
+  // Whether it takes nothing any more, and why.
+  [[nodiscard]] bool refuses() const {
+    return inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed) ||
+           saidGoodbye_.load(std::memory_order_relaxed);
+  }
+  [[nodiscard]] Error refusal() const;
   [[nodiscard]] KYTReporting::Statistics statistics() const;
   [[nodiscard]] KYTReporting::State state() const { return standing_.state(); }
   [[nodiscard]] std::string stateReason() const;
@@ -51,6 +57,8 @@ class Session {
   // Nothing runs for this session any more once it has returned (on the library's thread: once the running
   // completion has). Safe to call twice.
   void close();
+  // The same for who does not own it: any number of threads, beside close().
+  void stop();
 
   // In a child process just forked.
   void becomeInert();
@@ -78,11 +86,6 @@ class Session {
     std::string reason;
   };
 
-  [[nodiscard]] bool refuses() const {
-    return inert_.load(std::memory_order_relaxed) || closed_.load(std::memory_order_relaxed) ||
-           saidGoodbye_.load(std::memory_order_relaxed);
-  }
-  [[nodiscard]] Error refusal() const;
   void countRefusal();
   [[nodiscard]] bool ensureConnected(SteadyTime now) REQUIRES(libraryThread);
   void connect(SteadyTime now) REQUIRES(libraryThread);

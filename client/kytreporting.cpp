@@ -90,10 +90,32 @@ KYTReporting::Options optionsOf(const kyt_options& given) {
   return options;
 }
 
+thread_local kyt_error callbackError = KYT_ERROR_NONE;
+
+kyt_error numberOf(const std::optional<kyt::Error>& error) {
+  if (!error) return KYT_ERROR_NONE;
+  return error->domain == kyt::kKYTReportingClientErrorDomain ? static_cast<kyt_error>(error->code)
+                                                              : KYT_ERROR_BACK_END;
+}
+
+// Stands where a callback of the program runs: what kyt_callback_error() says there.
+class CallbackError {
+ public:
+  explicit CallbackError(const std::optional<kyt::Error>& error)
+      : before_(std::exchange(callbackError, numberOf(error))) {}
+  ~CallbackError() { callbackError = before_; }
+  CallbackError(const CallbackError&) = delete;
+  CallbackError& operator=(const CallbackError&) = delete;
+
+ private:
+  const kyt_error before_;  // of the callback in which this one runs
+};
+
 KYTReporting::StatesCompletion statesCompletion(kyt_states_callback callback, void* context) {
   if (callback == nullptr) return nullptr;
   return
       [callback, context](std::optional<std::vector<std::string>> states, std::optional<kyt::Error> error) {
+        const CallbackError current(error);
         std::vector<const char*> names;
         if (states)
           for (const std::string& name : *states) names.push_back(name.c_str());
@@ -105,17 +127,24 @@ KYTReporting::StatesCompletion statesCompletion(kyt_states_callback callback, vo
 KYTReporting::SuccessCompletion successCompletion(kyt_success_callback callback, void* context) {
   if (callback == nullptr) return nullptr;
   return [callback, context](bool success, const std::optional<kyt::Error>& error) {
+    const CallbackError current(error);
     callback(success ? 1 : 0, error ? error->localizedDescription.c_str() : nullptr, context);
   };
 }
 
+kyt::Error invalid(const char* why) {
+  return {kyt::kKYTReportingClientErrorDomain, static_cast<int32_t>(kyt::ClientError::invalid), why};
+}
+
 void refuse(kyt_success_callback callback, void* context, const char* why) {
+  const CallbackError current(invalid(why));
   if (callback != nullptr) callback(0, why, context);
 }
 
 KYTReporting::ObjectCompletion objectCompletion(kyt_text_callback callback, void* context) {
   if (callback == nullptr) return nullptr;
   return [callback, context](const Value& result, const std::optional<kyt::Error>& error) {
+    const CallbackError current(error);
     const std::string text = kyt::description(result);
     callback(result.isNull() ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr,
              context);
@@ -160,6 +189,15 @@ void kyt_array_append_string(kyt_array* array, const char* value) {
 void kyt_array_append_int(kyt_array* array, int64_t value) {
   append(array, value);
 }
+void kyt_array_append_uint(kyt_array* array, uint64_t value) {
+  append(array, value);
+}
+void kyt_array_append_bool(kyt_array* array, int value) {
+  append(array, value != 0);
+}
+void kyt_array_append_date(kyt_array* array, double seconds) {
+  append(array, kyt::Date{seconds});
+}
 void kyt_array_append_double(kyt_array* array, double value) {
   append(array, value);
 }
@@ -168,6 +206,9 @@ void kyt_array_append_data(kyt_array* array, const void* bytes, size_t length) {
     append(array, kyt::Data(std::string_view(static_cast<const char*>(bytes), length)));
 }
 void kyt_array_append_dictionary(kyt_array* array, const kyt_dictionary* value) {
+  if (value != nullptr) append(array, value->value);
+}
+void kyt_array_append_array(kyt_array* array, const kyt_array* value) {
   if (value != nullptr) append(array, value->value);
 }
 size_t kyt_array_count(const kyt_array* array) {
@@ -205,6 +246,9 @@ void kyt_dictionary_set_data(kyt_dictionary* dictionary, const char* key, const 
 void kyt_dictionary_set_dictionary(kyt_dictionary* dictionary, const char* key, const kyt_dictionary* value) {
   if (value != nullptr) set(dictionary, key, value->value);
 }
+void kyt_dictionary_set_array(kyt_dictionary* dictionary, const char* key, const kyt_array* value) {
+  if (value != nullptr) set(dictionary, key, value->value);
+}
 void kyt_dictionary_remove(kyt_dictionary* dictionary, const char* key) {
   if (dictionary != nullptr && key != nullptr) dictionary->value.remove(key);
 }
@@ -237,6 +281,15 @@ kyt_session* kyt_session_open(const kyt_options* options) {
 void kyt_session_close(kyt_session* session) {
   delete session;
 }
+void kyt_session_end(kyt_session* session) {
+  if (session != nullptr) session->reporting->close();
+}
+void kyt_close_all(void) {
+  KYTReporting::closeAll();
+}
+kyt_error kyt_callback_error(void) {
+  return callbackError;
+}
 int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds) {
   return session != nullptr && session->reporting->finish(std::chrono::milliseconds(timeout_milliseconds))
              ? 1
@@ -268,6 +321,15 @@ int kyt_session_send(kyt_session* session, uint32_t category, uint32_t type, con
              ? 1
              : 0;
 }
+kyt_error kyt_session_try_send(kyt_session* session, uint32_t category, uint32_t type,
+                               const kyt_dictionary* payload, uint32_t flag, char* error, size_t size) {
+  const std::optional<kyt::Error> problem =
+      session != nullptr ? session->reporting->trySendMessage(
+                               category, type, payload != nullptr ? payload->value : Dictionary(), flag)
+                         : invalid("there is no session");
+  copyText(problem ? problem->localizedDescription : "", error, size);
+  return numberOf(problem);
+}
 void kyt_session_send_with_reply(kyt_session* session, uint32_t category, uint32_t type,
                                  const kyt_dictionary* payload, uint32_t flag, kyt_text_callback callback,
                                  void* context) {
@@ -279,6 +341,7 @@ void kyt_session_fetch_display_url(kyt_session* session, kyt_text_callback callb
   if (session == nullptr || callback == nullptr) return;
   session->reporting->fetchDisplayURL([callback, context](const std::string& text,
                                                           const std::optional<kyt::Error>& error) {
+    const CallbackError current(error);
     callback(error ? nullptr : text.c_str(), error ? error->localizedDescription.c_str() : nullptr, context);
   });
 }
@@ -317,12 +380,14 @@ void kyt_total_statistics(kyt_statistics* statistics) {
 void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, kyt_text_callback callback, void* context) {
   if (options == nullptr || options->size == 0) {
+    const CallbackError current(invalid("the options are missing"));
     if (callback != nullptr) callback(nullptr, "the options are missing", context);
     return;
   }
   KYTReporting::sendSingleMessage(optionsOf(*options), category, type, optional(payload),
                                   [callback, context](std::string text, std::optional<kyt::Error> error) {
                                     if (callback == nullptr) return;
+                                    const CallbackError current(error);
                                     callback(error ? nullptr : text.c_str(),
                                              error ? error->localizedDescription.c_str() : nullptr, context);
                                   });

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <future>
 #include <string>
 #include <vector>
@@ -180,6 +181,108 @@ TEST(CInterface, ReadsBackWhatWasSetInADictionary) {
   kyt_dictionary_remove(dictionary, "s");
   EXPECT_EQ(kyt_dictionary_get_string(dictionary, "s"), nullptr);
   kyt_dictionary_free(dictionary);
+}
+
+TEST(CInterface, SendsArraysWithValuesOfEachKind) {
+  TemporaryFolder folder;
+  const std::string socket = folder / "socket";
+  TestDaemon daemon(socket);
+  ASSERT_TRUE(daemon.start());
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = socket.c_str();
+  kyt_session* session = kyt_session_open(&options);
+  kyt_array* inner = kyt_array_new();
+  kyt_array_append_bool(inner, 1);
+  kyt_array_append_uint(inner, UINT64_MAX);
+  kyt_array_append_date(inner, 1.5);
+  kyt_array* array = kyt_array_new();
+  kyt_array_append_array(array, inner);
+  kyt_array_append_array(array, nullptr);
+  kyt_array_append_string(array, "text");
+  kyt_dictionary* payload = kyt_dictionary_new();
+  kyt_dictionary_set_array(payload, "list", array);
+  kyt_array_append_int(array, 1);  // of the caller's alone
+  EXPECT_EQ(kyt_session_send(session, 1, 2, payload, 0), 1);
+  kyt_dictionary_free(payload);
+  kyt_array_free(array);
+  kyt_array_free(inner);
+  EXPECT_EQ(kyt_session_finish(session, 20000), 1);
+  kyt_session_close(session);
+  EXPECT_EQ(daemon.lastPayload(), (Dictionary{{"list", Array{Array{true, UINT64_MAX, Date{1.5}}, "text"}}}));
+}
+
+TEST(CInterface, SaysWhyAMessageWasNotTaken) {
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = "/nonexistent";
+  options.max_queued_messages = 64;
+  kyt_session* session = kyt_session_open(&options);
+  char text[128] = "?";
+  EXPECT_EQ(kyt_session_try_send(session, 1, 1, nullptr, 0, text, sizeof text), KYT_ERROR_NONE);
+  EXPECT_STREQ(text, "");
+  EXPECT_EQ(kyt_session_try_send(session, 70000, 1, nullptr, 0, text, sizeof text), KYT_ERROR_INVALID);
+  EXPECT_STREQ(text, "category 70000, type 1: both are whole numbers from 0 to 65535");
+  kyt_error last = KYT_ERROR_NONE;
+  for (int i = 0; i < 64; ++i) last = kyt_session_try_send(session, 1, 1, nullptr, 0, text, sizeof text);
+  EXPECT_EQ(last, KYT_ERROR_QUEUE_FULL);
+  EXPECT_STREQ(text, "the queue is full");
+  kyt_session_end(session);
+  EXPECT_EQ(kyt_session_try_send(session, 1, 1, nullptr, 0, text, sizeof text), KYT_ERROR_CLOSED);
+  EXPECT_STREQ(text, "the session is closed");
+  EXPECT_EQ(kyt_session_try_send(session, 1, 1, nullptr, 0, nullptr, 0), KYT_ERROR_CLOSED);
+  kyt_statistics figures{};
+  kyt_session_statistics(session, &figures);
+  EXPECT_EQ(figures.accepted, figures.lost_in_queue);
+  EXPECT_EQ(figures.dropped_closed, 2U);
+  kyt_session_end(session);
+  kyt_session_close(session);
+  EXPECT_EQ(kyt_session_try_send(nullptr, 1, 1, nullptr, 0, nullptr, 0), KYT_ERROR_INVALID);
+  kyt_session_end(nullptr);
+}
+
+TEST(CInterface, NumbersTheErrorOfACallbackWhileItRuns) {
+  TemporaryFolder folder;
+  const std::string socket = folder / "socket";
+  TestDaemon daemon(socket);
+  ASSERT_TRUE(daemon.start());
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = socket.c_str();
+  kyt_session* session = kyt_session_open(&options);
+  const kyt_text_callback keep = [](const char*, const char*, void* context) {
+    static_cast<std::promise<kyt_error>*>(context)->set_value(kyt_callback_error());
+  };
+  std::promise<kyt_error> flushed, sent, wrong;
+  kyt_session_flush(session, keep, &flushed);
+  EXPECT_EQ(answerOf(flushed), KYT_ERROR_BACK_END);
+  kyt_session_send_with_reply(session, 1, 1, nullptr, 0, keep, &sent);
+  EXPECT_EQ(answerOf(sent), KYT_ERROR_NONE);
+  kyt_session_send_with_reply(session, 70000, 1, nullptr, 0, keep, &wrong);
+  EXPECT_EQ(answerOf(wrong), KYT_ERROR_INVALID);
+  EXPECT_EQ(kyt_callback_error(), KYT_ERROR_NONE);
+  kyt_session_close(session);
+}
+
+TEST(CInterface, NoCallbackRunsOnceAllIsClosed) {
+  std::atomic<int> called{0};
+  const kyt_text_callback count = [](const char*, const char*, void* context) {
+    ++*static_cast<std::atomic<int>*>(context);
+  };
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = "/nonexistent";
+  options.call_deadline_milliseconds = -1;
+  kyt_session* session = kyt_session_open(&options);
+  for (int i = 0; i < 10; ++i) kyt_session_flush(session, count, &called);
+  kyt_close_all();
+  EXPECT_EQ(called, 10);
+  EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 0);
+  kyt_close_all();
+  kyt_session_close(session);
+  session = kyt_session_open(&options);
+  EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 1) << "one that is opened later works";
+  kyt_session_close(session);
 }
 
 TEST(CInterface, TakesMissingArgumentsWithoutHarm) {

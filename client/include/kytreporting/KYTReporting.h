@@ -196,6 +196,9 @@ class KYT_EXPORT KYTReporting {
   // is woken by the first message after a pause). Flags: 1 realtime, 2 expedite, 3 both, anything else
   // neither.
   bool sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag = 0);
+  // The same, and returns why the message was not taken; none: it was.
+  [[nodiscard]] std::optional<Error> trySendMessage(uint32_t category, uint32_t type, Dictionary payload,
+                                                    uint32_t flag = 0);
   // The same with the daemon's answer: the text of what was posted, or none.
   void sendMessage(uint32_t category, uint32_t type, Dictionary payload, uint32_t flag,
                    ObjectCompletion completion);
@@ -217,6 +220,12 @@ class KYT_EXPORT KYTReporting {
   // and none is there (see Options::finishWaitsForDaemon); stateReason() then says why. Called from a completion
   // it does not wait, and returns false.
   bool finish(std::chrono::milliseconds timeout = std::chrono::seconds(5));
+
+  // Closes without waiting, as the destructor does; the object stays, and takes nothing any more. Any number of threads.
+  void close();
+  // Closes all sessions and single messages of this process; the objects stay, and are closed ones. No completion runs on
+  // the library's thread once it has returned, unless a session is opened later.
+  static void closeAll();
 
   [[nodiscard]] Statistics statistics() const;
   // The sums over all sessions of this process, ended ones and single messages included; `queued` is of those that live.

@@ -47,6 +47,9 @@ KYT_API void kyt_dictionary_set_data(kyt_dictionary* dictionary, const char* key
 /* The value stays the caller's; later changes of it do not reach `dictionary`. */
 KYT_API void kyt_dictionary_set_dictionary(kyt_dictionary* dictionary, const char* key,
                                            const kyt_dictionary* value);
+typedef struct kyt_array kyt_array;
+/* The value stays the caller's; later changes of it do not reach `dictionary`. */
+KYT_API void kyt_dictionary_set_array(kyt_dictionary* dictionary, const char* key, const kyt_array* value);
 KYT_API void kyt_dictionary_remove(kyt_dictionary* dictionary, const char* key);
 KYT_API size_t kyt_dictionary_count(const kyt_dictionary* dictionary);
 /* The text of a string value, or null; valid until the dictionary changes. */
@@ -56,16 +59,34 @@ KYT_API int64_t kyt_dictionary_get_int(const kyt_dictionary* dictionary, const c
 KYT_API double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* key, double otherwise);
 
 /* Arrays: what uploaded log data is made of. */
-typedef struct kyt_array kyt_array;
 KYT_API kyt_array* kyt_array_new(void);
 KYT_API void kyt_array_free(kyt_array* array);
 KYT_API void kyt_array_append_string(kyt_array* array, const char* value);
 KYT_API void kyt_array_append_int(kyt_array* array, int64_t value);
+KYT_API void kyt_array_append_uint(kyt_array* array, uint64_t value);
 KYT_API void kyt_array_append_double(kyt_array* array, double value);
+KYT_API void kyt_array_append_bool(kyt_array* array, int value);
+/* Seconds since 1970. */
+KYT_API void kyt_array_append_date(kyt_array* array, double seconds);
 KYT_API void kyt_array_append_data(kyt_array* array, const void* bytes, size_t length);
 /* The value stays the caller's; later changes of it do not reach `array`. */
 KYT_API void kyt_array_append_dictionary(kyt_array* array, const kyt_dictionary* value);
+KYT_API void kyt_array_append_array(kyt_array* array, const kyt_array* value);
 KYT_API size_t kyt_array_count(const kyt_array* array);
+
+/* What is wrong, as a number. */
+typedef enum kyt_error {
+  KYT_ERROR_NONE = 0,
+  KYT_ERROR_NOT_CONNECTED = 1, /* the connection ended before the answer, or there is no daemon */
+  KYT_ERROR_CLOSED = 2,        /* the session was closed, or belongs to the parent of this process */
+  KYT_ERROR_QUEUE_FULL = 3,    /* the bounded queue had no room */
+  KYT_ERROR_REFUSED = 4,       /* the daemon answered with an error */
+  KYT_ERROR_INVALID = 5,       /* the arguments cannot be meant or sent so */
+  KYT_ERROR_TIMED_OUT = 6,     /* no daemon took the call within the call deadline */
+  KYT_ERROR_BACK_END = 7       /* what was asked for was tried, and failed: the text says what */
+} kyt_error;
+/* Of the error that a callback was given, while it runs, on its thread; KYT_ERROR_NONE otherwise. */
+KYT_API kyt_error kyt_callback_error(void);
 
 /* `error` is null when all went well; otherwise its text. Arguments are valid during the call only. */
 typedef void (*kyt_states_callback)(const char* const* names, size_t count, int has_storebag,
@@ -119,6 +140,13 @@ KYT_API int kyt_session_info_check(const kyt_dictionary* session_info, char* err
 KYT_API kyt_session* kyt_session_open(const kyt_options* options);
 /* What was queued and not sent is lost; finish first to keep it. No callback runs after it has returned. */
 KYT_API void kyt_session_close(kyt_session* session);
+/* The same without freeing it: it is still to be closed, and takes nothing any more. Any number of threads, beside calls
+ * of others to the session. */
+KYT_API void kyt_session_end(kyt_session* session);
+/* Ends all sessions and single messages of this process as kyt_session_close does, but frees no session: each is still to
+ * be closed. No callback runs on the library's thread once it has returned, unless a session is opened later: for
+ * languages that cannot be called any more when their program ends. */
+KYT_API void kyt_close_all(void);
 /* Sends what is queued, says goodbye, waits at most so many milliseconds; whether all was sent. Gives up at once when no
  * daemon ever took anything and none is there. */
 KYT_API int kyt_session_finish(kyt_session* session, unsigned timeout_milliseconds);
@@ -136,6 +164,11 @@ KYT_API void kyt_session_fetch_states(kyt_session* session, const kyt_dictionary
  * stays the caller's. Flags: 1 realtime, 2 expedite, 3 both. */
 KYT_API int kyt_session_send(kyt_session* session, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, uint32_t flag);
+/* The same, and says why a message was not taken: KYT_ERROR_NONE when it was; otherwise `error`, of `size` bytes (none:
+ * null and 0), gets a text, cut to fit and NUL-terminated. */
+KYT_API kyt_error kyt_session_try_send(kyt_session* session, uint32_t category, uint32_t type,
+                                       const kyt_dictionary* payload, uint32_t flag, char* error,
+                                       size_t size);
 /* The same with the daemon's answer: the text of what was posted, or null. */
 KYT_API void kyt_session_send_with_reply(kyt_session* session, uint32_t category, uint32_t type,
                                          const kyt_dictionary* payload, uint32_t flag,
