@@ -28,6 +28,13 @@ struct SendOptions {
   bool requireUserInfo = false;
 };
 
+struct ListenOptions {
+  std::string socket;
+  std::string live = "httppost";  // names, parted by commas
+  bool noStorebag = false, refuse = false;
+  uint64_t dieAfter = 0;  // messages; 0: never
+};
+
 struct SignOptions {
   std::string bag;                        // .json, .toml or .plist
   std::string key;                        // private key, PEM
@@ -96,6 +103,9 @@ struct SimulateOptions {
 
 [[nodiscard]] int sendCommand(const ConnectionOptions& connection, const SendOptions& options);
 [[nodiscard]] int sessionCommand(const ConnectionOptions& connection, const std::string& script);
+
+// Stands in for the daemon until SIGINT or SIGTERM, or its death: prints what programs tell it.
+[[nodiscard]] int listenCommand(const ListenOptions& options);
 
 [[nodiscard]] int defaultsReadCommand(const std::string& root, const std::string& domain,
                                       const std::string& key);

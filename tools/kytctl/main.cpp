@@ -21,6 +21,7 @@ using kyt::CommandOption;
 struct Arguments {
   ConnectionOptions connection;
   SendOptions send;
+  ListenOptions listen;
   SignOptions sign;
   CheckOptions check;
   ExplainOptions explain;
@@ -57,6 +58,11 @@ constexpr char kSessionSteps[] =
   {"do":"finish"}                                  sends what is queued and prints the figures
 
 The manual page kytctl tells more.)";
+
+constexpr char kListened[] =
+    R"(Each line is a JSON object; "event" is one of listening (when programs may come), session, configuration,
+states, message, flush, sharedData, digestKey, file, logData, finish (the graceful end) and end (of a connection).
+Dates are seconds since 1970, data is hexadecimal digits. It ends with SIGINT or SIGTERM. Nothing leaves it.)";
 
 constexpr char kExplained[] =
     R"(The event is a JSON object as it goes over the wire, or - for standard input:
@@ -103,6 +109,20 @@ void addSend(const Command& program, Arguments& a) {
   session.option("script", a.script, "A file, or - for standard input").required();
   session.ends(kSessionSteps);
   session.runs([&a] { a.status = sessionCommand(a.connection, a.script); });
+}
+
+void addListen(const Command& program, Arguments& a) {
+  const Command listen =
+      program.command("listen", "Stand in for the daemon in tests, and print what programs tell it");
+  ListenOptions& o = a.listen;
+  listen.option("--socket", o.socket, "Where to listen").required();
+  const CommandOption live =
+      listen.option("--live", o.live, "The live back ends of each session, parted by commas").showsDefault();
+  listen.flag("--no-storebag", o.noStorebag, "No client type has a storebag").excludes(live);
+  listen.flag("--refuse", o.refuse, "Serve nobody");
+  listen.option("--die-after", o.dieAfter, "End as if killed after so many messages");
+  listen.ends(kListened);
+  listen.runs([&a] { a.status = listenCommand(a.listen); });
 }
 
 void addExplain(const Command& program, Arguments& a) {
@@ -309,6 +329,7 @@ int main(int argc, char** argv) {
   program.needsCommand();
   program.takesOptionsAnywhere();
   addSend(program, arguments);
+  addListen(program, arguments);
   addExplain(program, arguments);
   addDefaults(program, arguments);
   addOwner(program, arguments);

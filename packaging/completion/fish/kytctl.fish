@@ -65,6 +65,7 @@ complete -c kytctl -l root -x -a '(__fish_complete_directories)' -d 'A folder in
 
 complete -c kytctl -n __kytctl_at -a send -d 'Send one event'
 complete -c kytctl -n __kytctl_at -a session -d 'Run a scripted session'
+complete -c kytctl -n __kytctl_at -a listen -d 'Stand in for the daemon in tests'
 complete -c kytctl -n __kytctl_at -a explain -d 'What becomes of an event'
 complete -c kytctl -n __kytctl_at -a defaults -d 'Read and change user defaults'
 complete -c kytctl -n __kytctl_at -a consent -d 'The consent of the owner'
@@ -98,6 +99,11 @@ complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate publish diff probe'
 
+complete -c kytctl -n '__kytctl_at -b listen' -l socket -r -F -d 'Where to listen'
+complete -c kytctl -n '__kytctl_at -b listen' -l live -x -d 'The live back ends, parted by commas'
+complete -c kytctl -n '__kytctl_at -b listen' -l no-storebag -d 'No client type has a storebag'
+complete -c kytctl -n '__kytctl_at -b listen' -l refuse -d 'Serve nobody'
+complete -c kytctl -n '__kytctl_at -b listen' -l die-after -x -d 'End as if killed after so many messages'
 for command in send session
     complete -c kytctl -n "__kytctl_at -b $command" -l socket -r -F -d 'The socket of the daemon'
     complete -c kytctl -n "__kytctl_at -b $command" -l timeout -x -d 'Seconds to wait for the daemon'

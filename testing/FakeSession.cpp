@@ -1,0 +1,114 @@
+#include "testing/FakeSession.h"
+
+#include <utility>
+
+#include "platform/base/Hex.h"
+#include "platform/objects/Keys.h"
+
+namespace kyt::testing {
+
+Event FakeSession::event(Kind kind) const {
+  Event made;
+  made.kind = kind;
+  made.connection = number_;
+  return made;
+}
+
+void FakeSession::setSessionInfo(Dictionary info, std::optional<Dictionary> user, Value /*frameworks*/,
+                                 bool aggregates) {
+  Event made = event(Kind::session);
+  made.sessionInfo = std::move(info);
+  made.userInfo = std::move(user);
+  made.aggregates = aggregates;
+  note(std::move(made));
+}
+
+void FakeSession::startConfigWithCompletionHandler(StatesReply reply) {
+  if (!note(event(Kind::configuration))) return keep(std::move(reply));
+  reply(states_);
+}
+
+void FakeSession::fetchStatesWithUserInfo(std::optional<Dictionary> user, StatesReply reply) {
+  Event made = event(Kind::states);
+  made.userInfo = std::move(user);
+  if (!note(std::move(made))) return keep(std::move(reply));
+  reply(states_);
+}
+
+void FakeSession::fetchDisplayURL(StringReply reply) {
+  if (!records_->isAlive()) return keep(std::move(reply));
+  reply("URL not available");
+}
+
+void FakeSession::sendMessageWithDictionary(Dictionary message, ObjectReply reply) {
+  Event made = event(Kind::message);
+  made.category = static_cast<uint16_t>(message.unsignedInteger(kKYTReportingMessageParametersCategory));
+  made.type = static_cast<uint16_t>(message.unsignedInteger(kKYTReportingMessageParametersType));
+  made.flag = message.unsignedInteger(kKYTReportingMessageParametersFlag);
+  if (const Dictionary* payload = message.dictionary(kKYTReportingMessageParametersPayload))
+    made.payload = *payload;
+  pending_ = true;
+  const bool noted = note(std::move(made));
+  if (!reply) return;
+  if (!noted || !records_->isAlive()) return keep(std::move(reply));
+  reply(Value());
+}
+
+void FakeSession::flushMessagesWithCompletion(ResultReply completion) {
+  if (!note(event(Kind::flush))) return keep(std::move(completion));
+  if (std::exchange(pending_, false)) return completion(Value(), std::nullopt);
+  completion(Value(), Error{kKYTReportingErrorDomain, -1, "Nothing to flush"});
+}
+
+void FakeSession::finishSessionGracefully() {
+  note(event(Kind::finish));
+}
+
+void FakeSession::uploadFileAtPath(String url, String /*token*/, std::optional<FileExtension> extension,
+                                   SuccessReply reply) {
+  Event made = event(Kind::file);
+  made.text = url.str();
+  if (!note(std::move(made))) return keep(std::move(reply));
+  reply(extension.has_value());
+}
+
+void FakeSession::uploadLogData(Value data, SuccessErrorReply reply) {
+  Event made = event(Kind::logData);
+  made.payload.set("logData", std::move(data));
+  if (!note(std::move(made))) return keep(std::move(reply));
+  reply(true, std::nullopt);
+}
+
+void FakeSession::sendMessageWithSessionInfo(Dictionary info, std::optional<Dictionary> user,
+                                             uint16_t category, uint16_t type,
+                                             std::optional<Dictionary> payload, StringReply reply) {
+  Event made = event(Kind::message);
+  made.single = true;
+  made.category = category;
+  made.type = type;
+  made.sessionInfo = std::move(info);
+  made.userInfo = std::move(user);
+  if (payload) made.payload = *std::move(payload);
+  if (!note(std::move(made)) || !records_->isAlive()) return keep(std::move(reply));
+  reply(states_ ? "finished" : "storebag not available");
+}
+
+void FakeSession::updateSharedDataWithDictionary(Dictionary data) {
+  Event made = event(Kind::sharedData);
+  made.payload = std::move(data);
+  note(std::move(made));
+}
+
+void FakeSession::updateSharedDataForKey(String key, Value value) {
+  Event made = event(Kind::sharedData);
+  made.payload.set(std::move(key), std::move(value));
+  note(std::move(made));
+}
+
+void FakeSession::setDigestKey(Data key, int32_t /*algorithm*/) {
+  Event made = event(Kind::digestKey);
+  appendHex(key.bytes(), made.text);
+  note(std::move(made));
+}
+
+}  // namespace kyt::testing

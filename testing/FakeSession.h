@@ -1,0 +1,54 @@
+// One connection of the fake daemon: notes what its program calls, and answers as the real daemon would where all is well.
+// Called on the connection's queue.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <utility>
+
+#include "platform/ipc/ClientSessionInterface.h"
+#include "testing/Records.h"
+
+namespace kyt::testing {
+
+class FakeSession final : public ClientSessionInterface {
+ public:
+  // What configurations bring: names of back ends, or none.
+  FakeSession(uint64_t number, std::shared_ptr<Records> records, std::optional<Array> states)
+      : number_(number), records_(std::move(records)), states_(std::move(states)) {}
+
+  void setSessionInfo(Dictionary info, std::optional<Dictionary> user, Value frameworks,
+                      bool aggregates) override;
+  void startConfigWithCompletionHandler(StatesReply reply) override;
+  void fetchStatesWithUserInfo(std::optional<Dictionary> user, StatesReply reply) override;
+  void fetchDisplayURL(StringReply reply) override;
+  void sendMessageWithDictionary(Dictionary message, ObjectReply reply) override;
+  void flushMessagesWithCompletion(ResultReply completion) override;
+  void finishSessionGracefully() override;
+  void uploadFileAtPath(String url, String token, std::optional<FileExtension> extension,
+                        SuccessReply reply) override;
+  void uploadLogData(Value data, SuccessErrorReply reply) override;
+  void sendMessageWithSessionInfo(Dictionary info, std::optional<Dictionary> user, uint16_t category,
+                                  uint16_t type, std::optional<Dictionary> payload,
+                                  StringReply reply) override;
+  void updateSharedDataWithDictionary(Dictionary data) override;
+  void updateSharedDataForKey(String key, Value value) override;
+  void setDigestKey(Data key, int32_t algorithm) override;
+
+ private:
+  [[nodiscard]] Event event(Kind kind) const;
+  // False: the daemon is dead.
+  bool note(Event event) const { return records_->add(std::move(event)); }
+  // Of a dead daemon: an answer that is dropped would be an error, so it is kept until the connection is gone.
+  template <typename Reply>
+  void keep(Reply reply) {
+    records_->keepAnswer([kept = std::move(reply)] {});
+  }
+
+  const uint64_t number_;
+  const std::shared_ptr<Records> records_;  // with the other connections, and the daemon
+  const std::optional<Array> states_;
+  bool pending_ = false;  // messages came since the last flush
+};
+
+}  // namespace kyt::testing
