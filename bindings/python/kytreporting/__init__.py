@@ -1,0 +1,57 @@
+"""Report events to kytreportingd from Python.
+
+    import kytreporting as kyt
+
+    with kyt.Session(client_type=20, client="example", service="demo") as session:
+        session.send(10, 1, step=1, duration=0.25)
+
+A session describes the program to the daemon and sends messages: each a category, a type and a payload. Nothing blocks
+on the daemon or the network but what says so: messages go into a bounded queue, and one thread of libkytreporting talks
+to the daemon. A daemon that is not there, dies or comes back is waited for and told again who the session is. Nothing
+is lost without being counted: see Session.statistics().
+
+Every operation may be called from any thread. After os.fork() the child goes on with a session of its own, opened at
+its first use. What is queued when the program ends is sent, for a second at most.
+
+The page "Reporting from a program" has the whole story: PROGRAMS.md in the documents of libkytreporting-dev.
+"""
+
+from ._errors import (
+    BackEndError,
+    ClosedError,
+    Error,
+    InvalidError,
+    NotConnectedError,
+    QueueFullError,
+    RefusedError,
+    TimedOutError,
+)
+from ._logging import LoggingHandler
+from ._session import Flag, Session, State, send_single, total_statistics
+from ._statistics import Statistics
+from ._timing import Counter, Timer
+from ._values import Payload, Scalar
+
+__version__ = "8.0.0"
+
+__all__ = [
+    "BackEndError",
+    "ClosedError",
+    "Counter",
+    "Error",
+    "Flag",
+    "InvalidError",
+    "LoggingHandler",
+    "NotConnectedError",
+    "Payload",
+    "QueueFullError",
+    "RefusedError",
+    "Scalar",
+    "Session",
+    "State",
+    "Statistics",
+    "TimedOutError",
+    "Timer",
+    "send_single",
+    "total_statistics",
+]

@@ -1,0 +1,529 @@
+"""Sessions."""
+
+from __future__ import annotations
+
+import asyncio
+import atexit
+import concurrent.futures
+import ctypes
+import enum
+import functools
+import itertools
+import os
+import secrets
+import sys
+import threading
+import time
+import weakref
+from types import TracebackType
+from typing import Any, Callable, Dict, List, Mapping, Optional, Sequence, Tuple, Type, Union
+
+from . import _calls
+from ._errors import ClosedError, Error, InvalidError, error_of
+from ._library import STATE_CALLBACK, Figures, Options, lib
+from ._statistics import Statistics, statistics_of
+from ._timing import Counter, Timer
+from ._values import Array, Dictionary, Payload
+
+_REASON_BYTES = 512
+_LAST_SECOND = 1.0  # what the end of a program waits for messages that are queued
+
+
+class State(enum.IntEnum):
+    """How far a session's messages get, as far as the library can know."""
+
+    NO_DAEMON = 0
+    """No connection: no socket, nobody listens, or the connection ended."""
+    REFUSED = 1
+    """The daemon does not serve this program."""
+    CONNECTED = 2
+    """Connected, and not configured yet: the daemon drops what is sent."""
+    NO_STOREBAG = 3
+    """Configured; no storebag, or one without back ends: the daemon drops all."""
+    NO_LIVE_BACK_END = 4
+    """Configured, and no back end takes events."""
+    LIVE = 5
+    """At least one back end takes events."""
+
+
+class Flag(enum.IntFlag):
+    """How a message is to leave."""
+
+    NONE = 0
+    """As configured: batched or sent."""
+    REALTIME = 1
+    """Sent at once, to the realtime address; what was batched before goes first."""
+    EXPEDITE = 2
+    """A session held back by sampling is let go with the next message."""
+
+
+class _Places(threading.local):
+    """For texts that the library writes, one for each thread."""
+
+    def __init__(self) -> None:
+        self.text = ctypes.create_string_buffer(_REASON_BYTES)
+
+    def read(self) -> str:
+        return self.text.value.decode("utf-8", "replace")
+
+
+_places = _Places()
+_sessions: "weakref.WeakValueDictionary[int, Session]" = weakref.WeakValueDictionary()
+_numbers = itertools.count(1)
+_program: Dict[str, bool] = {"ended": False}
+
+
+def _tell_state(state: int, why: bytes, number: int) -> None:
+    session = _sessions.get(number)
+    if session is None or session._told is None:
+        return
+    before = getattr(_calls.within, "callback", False)
+    _calls.within.callback = True
+    try:
+        session._told(State(state), why.decode("utf-8", "replace"))
+    finally:
+        _calls.within.callback = before
+
+
+_on_state_change = STATE_CALLBACK(_tell_state)
+
+
+def _bytes_of(text: Optional[str]) -> Optional[bytes]:
+    return None if text is None else os.fsencode(text)
+
+
+def _checked(information: Mapping[str, Any]) -> None:
+    with Dictionary(information) as dictionary:
+        if not lib.kyt_session_info_check(dictionary.pointer, _places.text, _REASON_BYTES):
+            raise InvalidError(_places.read())
+
+
+def _names(client: Optional[str], service: Optional[str], more: Optional[Payload]) -> Optional[Dict[str, Any]]:
+    user: Dict[str, Any] = dict(more or {})
+    if client is not None:
+        user["ClientName"] = client
+    if service is not None:
+        user["ServiceName"] = service
+    return user or None
+
+
+class Session:
+    """One reporting session.
+
+    client_type: 0 to 23, which kind of client; types 5 to 23 have a storebag.
+    client, service: choose the storebag's entry for this program, and go with every record.
+    user_info: further entries that go with every record.
+    session_id: 32 bits, yours; a random one otherwise. client_version: 16 bits.
+    batch: events are collected until a flush, a threshold or the session's end.
+    require_user_info: the owner's consent, and country, device, filter and sampling rules apply. False is for what says
+        nothing about anyone.
+    hierarchy: token and level, for sessions that belong together: 0 is the top. Make the token 128 random bits as text.
+    socket: the daemon's, instead of the environment's KYTREPORTING_SOCKET or the fixed one.
+    max_queued_messages, max_queued_bytes: bounds of the queue (64 to 65536; at least 4096).
+    on_state_change: called as (State, reason) on the library's thread; it must not wait for answers.
+    call_deadline: seconds that an answer waits for a daemon that is not there; 0: as long as the session lives.
+    finish_waits_for_daemon: whether finish() waits for a daemon that was never there.
+    configure: asks to be configured at once. Without, nothing arrives before configure() was called.
+
+    Raises InvalidError for information that cannot be meant so. Opening never waits: a daemon that is not there yet is
+    waited for. In a forked child the session is opened anew at its first use, with figures of its own.
+    """
+
+    def __init__(
+        self,
+        client_type: int,
+        client: Optional[str] = None,
+        service: Optional[str] = None,
+        *,
+        user_info: Optional[Payload] = None,
+        session_id: Optional[int] = None,
+        client_version: int = 0,
+        batch: bool = False,
+        require_user_info: bool = True,
+        hierarchy: Optional[Tuple[str, int]] = None,
+        socket: Optional[str] = None,
+        max_queued_messages: int = 0,
+        max_queued_bytes: int = 0,
+        on_state_change: Optional[Callable[[State, str], object]] = None,
+        call_deadline: float = 30.0,
+        finish_waits_for_daemon: bool = False,
+        configure: bool = True,
+    ) -> None:
+        self._information: Dict[str, Any] = {
+            "SessionID": secrets.randbits(32) if session_id is None else session_id,
+            "ClientType": client_type,
+            "ClientVersion": client_version,
+            "BatchEvent": batch,
+            "RequireUserInfo": require_user_info,
+        }
+        if hierarchy is not None:
+            self._information["HierarchyToken"] = {"TokenID": hierarchy[0], "Level": hierarchy[1]}
+        _checked(self._information)
+        self._user = _names(client, service, user_info)
+        self._socket = socket
+        self._bounds = (max_queued_messages, max_queued_bytes)
+        self._told = on_state_change
+        self._deadline = call_deadline
+        self._waits = finish_waits_for_daemon
+        self._configured = configure
+        self._shared: Dict[str, Any] = {}
+        self._digest: Optional[Tuple[bytes, int]] = None
+        self._counters: "weakref.WeakSet[Counter]" = weakref.WeakSet()
+        self._ended = False
+        self._lock = threading.Lock()  # while it is opened
+        self._pointer: Optional[int] = None
+        self._finalizer: Optional[weakref.finalize] = None
+        self._number = next(_numbers)  # under which the library's callbacks find it
+        _sessions[self._number] = self
+        self._handle()
+
+    # --- opening, here and in a forked child
+
+    def _handle(self) -> int:
+        pointer = self._pointer
+        if pointer is not None:
+            return pointer
+        with self._lock:
+            if self._pointer is None:
+                if self._ended:
+                    raise ClosedError("the session is closed")
+                if _program["ended"]:
+                    raise ClosedError("the program ends")
+                self._pointer = self._opened()
+            return self._pointer
+
+    def _opened(self) -> int:
+        options = Options(size=ctypes.sizeof(Options))
+        options.socket_path = _bytes_of(self._socket)
+        options.max_queued_messages, options.max_queued_bytes = self._bounds
+        options.call_deadline_milliseconds = int(self._deadline * 1000) or -1
+        options.finish_waits_for_daemon = self._waits
+        if self._told is not None:
+            options.on_state_change = _on_state_change
+            options.state_context = self._number
+        with Dictionary(self._information) as information, Dictionary(self._user) as user:
+            options.session_info = information.pointer
+            if self._user is not None:
+                options.user_info = user.pointer
+            pointer: int = lib.kyt_session_open(ctypes.byref(options))
+        self._finalizer = weakref.finalize(self, lib.kyt_session_close, pointer)
+        self._finalizer.atexit = False
+        if self._configured:
+            lib.kyt_session_configure(pointer, _calls.nobody, None)
+        if self._shared:
+            with Dictionary(self._shared) as entries:
+                lib.kyt_session_update_shared_data(pointer, entries.pointer)
+        if self._digest is not None:
+            lib.kyt_session_set_digest_key(pointer, self._digest[0], len(self._digest[0]), self._digest[1])
+        return pointer
+
+    def _leave_to_parent(self) -> None:
+        if self._finalizer is not None:
+            self._finalizer.detach()
+        self._finalizer = None
+        self._pointer = None
+        self._lock = threading.Lock()
+        for counter in list(self._counters):
+            counter._start_anew()
+
+    # --- messages
+
+    def send(
+        self, category: int, type: int, payload: Optional[Payload] = None, /, *, flag: int = Flag.NONE, **fields: Any
+    ) -> bool:
+        """Queues one message; whether there was room for it. Category and type are 0 to 65535; category 0 is the daemon's.
+
+        The payload is a mapping, keywords, or both. What reaches a server are texts, numbers, booleans and dates. Raises
+        InvalidError for what cannot be meant so, ClosedError after the end. Does not wait for anything.
+        """
+        with _message(category, type, payload, fields) as dictionary:
+            problem = lib.kyt_session_try_send(
+                self._handle(), category, type, dictionary.pointer, flag, _places.text, _REASON_BYTES
+            )
+        if problem == 0:
+            return True
+        if problem == 3:
+            return False
+        raise error_of(problem, _places.read())
+
+    def send_with_reply(
+        self,
+        category: int,
+        type: int,
+        payload: Optional[Payload] = None,
+        /,
+        *,
+        flag: int = Flag.NONE,
+        timeout: Optional[float] = None,
+        **fields: Any,
+    ) -> Optional[str]:
+        """The same, and waits for the daemon's answer: the text of what was posted, or None."""
+        return _calls.wait(self._reply(category, type, payload, fields, flag), timeout)
+
+    async def asend_with_reply(
+        self, category: int, type: int, payload: Optional[Payload] = None, /, *, flag: int = Flag.NONE, **fields: Any
+    ) -> Optional[str]:
+        """send_with_reply() for asyncio."""
+        return await asyncio.wrap_future(self._reply(category, type, payload, fields, flag))
+
+    def _reply(
+        self, category: int, type: int, payload: Optional[Payload], fields: Mapping[str, Any], flag: int
+    ) -> "concurrent.futures.Future[Optional[str]]":
+        with _message(category, type, payload, fields) as dictionary:
+            handle = self._handle()
+            number, future = _calls.begin()
+            lib.kyt_session_send_with_reply(
+                handle, category, type, dictionary.pointer, flag, _calls.on_text, number
+            )
+        return future
+
+    def timed(self, category: int, type: int, /, **fields: Any) -> Timer:
+        """For a with statement, or to decorate a function: sends how long it took, see Timer."""
+        return Timer(self, category, type, **fields)
+
+    def counter(self, category: int, type: int, /, *, interval: float = 60.0, **fields: Any) -> Counter:
+        """Sums up what is too frequent for messages of its own, see Counter."""
+        counter = Counter(self, category, type, interval=interval, **fields)
+        self._counters.add(counter)
+        return counter
+
+    # --- calls with an answer
+
+    def configure(self, timeout: Optional[float] = None) -> Optional[List[str]]:
+        """Asks the daemon to configure the session. The names of the live back ends; None without a storebag."""
+        self._configured = True
+        number, future = self._begin()
+        lib.kyt_session_configure(self._handle(), _calls.on_states, number)
+        states: Optional[List[str]] = _calls.wait(future, timeout)
+        return states
+
+    def fetch_states(
+        self, user_info: Optional[Payload] = None, *, timeout: Optional[float] = None
+    ) -> Optional[List[str]]:
+        """The live back ends. With user information that takes the place of what there was: then as of that."""
+        return _calls.wait(self._states(user_info), timeout)
+
+    async def afetch_states(self, user_info: Optional[Payload] = None) -> Optional[List[str]]:
+        """fetch_states() for asyncio."""
+        return await asyncio.wrap_future(self._states(user_info))
+
+    def _states(self, user_info: Optional[Payload]) -> "concurrent.futures.Future[Optional[List[str]]]":
+        if user_info is not None:
+            self._user = dict(user_info)
+        with Dictionary(self._user) as user:
+            number, future = self._begin()
+            pointer = None if self._user is None else user.pointer
+            lib.kyt_session_fetch_states(self._handle(), pointer, _calls.on_states, number)
+        return future
+
+    def fetch_display_url(self, timeout: Optional[float] = None) -> Optional[str]:
+        """The address for people that the storebag names."""
+        number, future = self._begin()
+        lib.kyt_session_fetch_display_url(self._handle(), _calls.on_text, number)
+        url: Optional[str] = _calls.wait(future, timeout)
+        return url
+
+    def flush(self, timeout: Optional[float] = None) -> Optional[str]:
+        """Posts what is batched, and waits for the servers. The text of what was posted, where it may be shown.
+
+        Raises BackEndError with the first back end's text, such as "Nothing to flush".
+        """
+        return _calls.wait(self._flush(), timeout)
+
+    async def aflush(self) -> Optional[str]:
+        """flush() for asyncio."""
+        return await asyncio.wrap_future(self._flush())
+
+    def _flush(self) -> "concurrent.futures.Future[Optional[str]]":
+        for counter in list(self._counters):
+            counter.send()
+        number, future = self._begin()
+        lib.kyt_session_flush(self._handle(), _calls.on_text, number)
+        return future
+
+    def upload_file(self, path: Union[str, "os.PathLike[str]"], timeout: Optional[float] = None) -> bool:
+        """Whether a back end took the file. It is opened at once, with this program's rights."""
+        number, future = self._begin()
+        lib.kyt_session_upload_file(self._handle(), os.fsencode(path), _calls.on_success, number)
+        taken: bool = _calls.wait(future, timeout)
+        return taken
+
+    def upload_log_data(self, log_data: Sequence[Any], timeout: Optional[float] = None) -> bool:
+        """Whether a back end took the data."""
+        with Array(log_data) as array:
+            number, future = self._begin()
+            lib.kyt_session_upload_log_data(self._handle(), array.pointer, _calls.on_success, number)
+        taken: bool = _calls.wait(future, timeout)
+        return taken
+
+    def _begin(self) -> "Tuple[int, concurrent.futures.Future[Any]]":
+        self._handle()  # raises before a number is given out
+        return _calls.begin()
+
+    # --- what the session shares and signs with
+
+    def update_shared_data(self, entries: Optional[Payload] = None, /, **more: Any) -> None:
+        """What goes into the records of all sessions of the hierarchy."""
+        merged = {**(entries or {}), **more}
+        with Dictionary(merged) as dictionary:
+            lib.kyt_session_update_shared_data(self._handle(), dictionary.pointer)
+        self._shared.update(merged)
+
+    def remove_shared_data(self, key: str) -> None:
+        """Takes one entry of it back."""
+        lib.kyt_session_remove_shared_data(self._handle(), key.encode())
+        self._shared.pop(key, None)
+
+    def set_digest_key(self, key: bytes, algorithm: int = 0) -> None:
+        """Key of the digests of the posts of the back end "qrs"; algorithm 0 is HMAC-SHA1."""
+        lib.kyt_session_set_digest_key(self._handle(), key, len(key), algorithm)
+        self._digest = (key, algorithm)
+
+    # --- where it stands
+
+    @property
+    def state(self) -> State:
+        """Where the session stands."""
+        return State(lib.kyt_session_state(self._handle()))
+
+    @property
+    def state_reason(self) -> str:
+        """Why, as a text for people."""
+        lib.kyt_session_state_reason(self._handle(), _places.text, _REASON_BYTES)
+        return _places.read()
+
+    def statistics(self) -> Statistics:
+        """Where the session's messages are. In a forked child they begin at zero."""
+        figures = Figures()
+        if self._pointer is not None or not self._ended:
+            lib.kyt_session_statistics(self._handle(), ctypes.byref(figures))
+        return statistics_of(figures)
+
+    # --- the end
+
+    def finish(self, timeout: float = 5.0) -> bool:
+        """Sends what is queued, says goodbye and waits so many seconds at most; whether the daemon has taken all.
+
+        Gives up at once where no daemon ever took anything and none is there. False also when it has ended before.
+        """
+        if self._pointer is None:  # nothing was sent in this forked child
+            self._ended = True
+            return True
+        for counter in list(self._counters):
+            if not self._ended:
+                counter.send()
+        self._ended = True
+        return bool(lib.kyt_session_finish(self._pointer, max(0, int(timeout * 1000))))
+
+    async def afinish(self, timeout: float = 5.0) -> bool:
+        """finish() for asyncio: a thread of the loop's executor waits."""
+        finish = functools.partial(self.finish, timeout)
+        return await asyncio.get_running_loop().run_in_executor(None, finish)
+
+    def close(self) -> None:
+        """Ends the session without waiting: what is queued is lost. No callback runs once it has returned."""
+        self._ended = True
+        if self._pointer is not None:
+            lib.kyt_session_end(self._pointer)
+
+    def __enter__(self) -> "Session":
+        return self
+
+    def __exit__(
+        self,
+        kind: Optional[Type[BaseException]],
+        value: Optional[BaseException],
+        traceback: Optional[TracebackType],
+    ) -> None:
+        self.finish()
+        self.close()
+
+    async def __aenter__(self) -> "Session":
+        return self
+
+    async def __aexit__(
+        self,
+        kind: Optional[Type[BaseException]],
+        value: Optional[BaseException],
+        traceback: Optional[TracebackType],
+    ) -> None:
+        await self.afinish()
+        self.close()
+
+
+def _message(category: int, type: int, payload: Optional[Payload], fields: Mapping[str, Any]) -> Dictionary:
+    for number in (category, type):
+        if not isinstance(number, int):
+            raise InvalidError("category and type are whole numbers")
+        if not 0 <= number < 2**32:  # the library refuses the rest, and counts it
+            raise InvalidError(f"category {category}, type {type}: both are whole numbers from 0 to 65535")
+    if payload is None:
+        return Dictionary(fields)
+    return Dictionary({**payload, **fields} if fields else payload)
+
+
+def total_statistics() -> Statistics:
+    """The sums over all sessions of this process, ended ones and single messages included."""
+    figures = Figures()
+    lib.kyt_total_statistics(ctypes.byref(figures))
+    return statistics_of(figures)
+
+
+def send_single(
+    category: int,
+    type: int,
+    payload: Optional[Payload] = None,
+    /,
+    *,
+    client_type: int,
+    client: Optional[str] = None,
+    service: Optional[str] = None,
+    user_info: Optional[Payload] = None,
+    session_id: int = 1,
+    require_user_info: bool = True,
+    socket: Optional[str] = None,
+    timeout: Optional[float] = None,
+    **fields: Any,
+) -> str:
+    """One event without a session, on a connection of its own; waits for the answer.
+
+    "finished": the daemon had a storebag and has offered the event to its back ends; or "storebag not available".
+    """
+    information = {"SessionID": session_id, "ClientType": client_type, "RequireUserInfo": require_user_info}
+    _checked(information)
+    user_entries = _names(client, service, user_info)
+    options = Options(size=ctypes.sizeof(Options))
+    options.socket_path = _bytes_of(socket)
+    with Dictionary(information) as session_info, Dictionary(user_entries) as user:
+        with _message(category, type, payload, fields) as message:
+            options.session_info = session_info.pointer
+            if user_entries is not None:
+                options.user_info = user.pointer
+            number, future = _calls.begin()
+            lib.kyt_send_single_message(
+                ctypes.byref(options), category, type, message.pointer, _calls.on_text, number
+            )
+    return _calls.wait(future, timeout) or ""
+
+
+def _at_exit() -> None:
+    """What is queued is sent, then nothing of the library's calls into the interpreter any more."""
+    end = time.monotonic() + _LAST_SECOND
+    for session in list(_sessions.values()):
+        if session._pointer is not None and not session._ended:
+            try:
+                session.finish(max(0.0, end - time.monotonic()))
+            except Error as error:  # of a counter's last message
+                print(f"kytreporting: {error}", file=sys.stderr)
+    _program["ended"] = True
+    lib.kyt_close_all()
+
+
+def _after_fork_in_child() -> None:
+    _calls.forget_all()
+    for session in list(_sessions.values()):
+        session._leave_to_parent()
+
+
+atexit.register(_at_exit)
+os.register_at_fork(after_in_child=_after_fork_in_child)

@@ -1,0 +1,86 @@
+def test_what_is_queued_when_the_program_ends_is_sent(kyt_listener, program):
+    program(
+        """
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        for number in range(100):
+            session.send(1, 1, number=number)
+        """
+    )
+    assert len(kyt_listener.wait_for("message", 100)) == 100
+    kyt_listener.wait_for("finish")
+
+
+def test_a_program_ends_at_once_where_no_daemon_is(program, tmp_path):
+    said = program(
+        """
+        import time
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        session.send(1, 1)
+        """,
+        KYTREPORTING_SOCKET=str(tmp_path / "none"),
+    )
+    assert said == ""
+
+
+def test_no_answer_reaches_an_interpreter_that_has_ended(kyt_listener, program):
+    # Calls of every kind are on their way, from a thread that the end does not wait for.
+    for _ in range(10):
+        program(
+            """
+            import threading
+            import kytreporting as kyt
+            from kytreporting import _calls
+            session = kyt.Session(20, on_state_change=lambda state, why: None)
+            begun = threading.Event()
+            def until_the_end(what):
+                try:
+                    for _ in range(200):
+                        what()
+                        begun.set()
+                except kyt.Error:
+                    pass
+            def ask():
+                session._states(None), session._flush(), session._reply(1, 1, None, {}, 0)
+            for what in (ask, lambda: kyt.send_single(1, 1, client_type=20)):
+                threading.Thread(target=until_the_end, args=(what,), daemon=True).start()
+            begun.wait()
+            """
+        )
+
+
+def test_an_error_in_a_callback_is_told_and_harms_nobody(kyt_listener, program):
+    said = program(
+        """
+        import sys, threading
+        import kytreporting as kyt
+        told = threading.Event()
+        def unraisable(what):
+            print(what.exc_value)
+            told.set()
+        sys.unraisablehook = unraisable
+        def wrong(state, why):
+            raise KeyError("mine")
+        with kyt.Session(20, on_state_change=wrong) as session:
+            assert told.wait(20)
+            assert session.configure() == ["httppost"]
+        """
+    )
+    assert "'mine'" in said
+
+
+def test_nothing_is_opened_when_the_program_has_ended(kyt_listener, program):
+    said = program(
+        """
+        import atexit
+        def late():
+            try:
+                kyt.Session(20)
+            except kyt.ClosedError as error:
+                print(error)
+        atexit.register(late)  # runs after the module's own
+        import kytreporting as kyt
+        """
+    )
+    assert said == "the program ends\n"

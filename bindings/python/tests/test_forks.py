@@ -1,0 +1,104 @@
+import json
+
+from conftest import eventually
+
+
+def test_a_child_goes_on_with_a_session_of_its_own(kyt_listener, program):
+    said = program(
+        """
+        import json, os
+        import kytreporting as kyt
+        session = kyt.Session(20, "x", session_id=5)
+        session.update_shared_data(kind="call")
+        session.send(1, 1)
+        assert session.configure() == ["httppost"]
+        child = os.fork()
+        if child == 0:
+            assert session.statistics().accepted == 0
+            session.send(1, 2)
+            finished = session.finish()
+            print(json.dumps([finished, session.statistics().sent]), flush=True)
+            os._exit(0)
+        os.waitpid(child, 0)
+        session.send(1, 3)
+        print(json.dumps([session.finish(), session.statistics().sent]))
+        """
+    )
+    assert [json.loads(line) for line in said.splitlines()] == [[True, 1], [True, 2]]
+    assert [event["sessionInfo"]["SessionID"] for event in kyt_listener.events("session")] == [5, 5]
+    assert sorted((e["connection"], e["type"]) for e in kyt_listener.wait_for("message", 3)) == [(1, 1), (1, 3), (2, 2)]
+    assert len(kyt_listener.events("sharedData")) == 2
+
+
+def test_a_child_that_does_not_report_opens_nothing(kyt_listener, program):
+    program(
+        """
+        import os
+        import kytreporting as kyt
+        with kyt.Session(20) as session:
+            session.configure()
+            if os.fork() == 0:
+                session.finish()
+                os._exit(0)
+            os.wait()
+        """
+    )
+    kyt_listener.wait_for("end")
+    assert len(kyt_listener.events("session")) == 1
+
+
+def test_forks_beside_busy_threads_harm_nobody(kyt_listener, program):
+    said = program(
+        """
+        import os, threading
+        import kytreporting as kyt
+        session = kyt.Session(20, max_queued_messages=65536)
+        stop = threading.Event()
+        def report():
+            while not stop.is_set():
+                session.send(1, 1)
+        def ask():
+            while not stop.is_set():
+                session.fetch_states()
+        threads = [threading.Thread(target=what) for what in (report, ask)]
+        for thread in threads:
+            thread.start()
+        for number in range(20):
+            child = os.fork()
+            if child == 0:
+                session.send(1, 2)
+                status = 0 if session.finish(20) and session.statistics().sent == 1 else 1
+                os._exit(status)
+            assert os.waitpid(child, 0)[1] == 0, number
+        stop.set()
+        for thread in threads:
+            thread.join()
+        assert session.finish(20)
+        figures = session.statistics()
+        assert figures.accepted == figures.sent + figures.queued + figures.dropped
+        print(figures.sent)
+        """
+    )
+    messages = kyt_listener.wait_for("message", int(said) + 20)
+    assert sum(message["type"] == 2 for message in messages) == 20
+    assert sum(message["type"] == 1 for message in messages) == int(said)
+
+
+def test_a_session_that_was_closed_before_the_fork_stays_closed(kyt_listener, program):
+    said = program(
+        """
+        import os
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        session.finish()
+        if os.fork() == 0:
+            try:
+                session.send(1, 1)
+            except kyt.ClosedError as error:
+                print(error, flush=True)
+            os._exit(0)
+        os.wait()
+        """
+    )
+    assert said == "the session is closed\n"
+    assert eventually(lambda: len(kyt_listener.events("end")) == 1)

@@ -1,0 +1,27 @@
+import pytest
+from conftest import eventually
+
+import kytreporting as kyt
+from kytreporting.testing import Listener
+
+
+def test_a_listener_dies_after_so_many_messages():
+    with Listener(die_after=2) as listener:
+        session = kyt.Session(20, socket=listener.socket_path)
+        for number in range(2):
+            session.send(1, number)
+        assert eventually(lambda: not listener.is_running)
+        assert [event["type"] for event in listener.wait_for("message", 2)] == [0, 1]
+        session.close()
+
+
+def test_a_listener_names_what_did_not_come():
+    with Listener() as listener:
+        with pytest.raises(TimeoutError, match="0 of 1 events message came within 0.01 s"):
+            listener.wait_for("message", timeout=0.01)
+
+
+def test_a_listener_says_that_it_cannot_listen(tmp_path, capfd):
+    with pytest.raises(RuntimeError, match="status 1"):
+        Listener(str(tmp_path / "missing" / "socket")).start()
+    assert "kytctl: " in capfd.readouterr().err

@@ -1,0 +1,76 @@
+import asyncio
+import threading
+
+import pytest
+
+import kytreporting as kyt
+
+
+def test_a_timer_sends_how_long_it_took(kyt_listener):
+    with kyt.Session(20) as session:
+        with session.timed(20, 1, step="index"):
+            pass
+
+        @session.timed(20, 2)
+        def twice(number):
+            """Doubles."""
+            return 2 * number
+
+        assert twice(4) == 8 and twice.__doc__ == "Doubles."
+    first, second = kyt_listener.wait_for("message", 2)
+    assert first["payload"]["step"] == "index" and 0 <= first["payload"]["duration"] < 10
+    assert second["type"] == 2 and list(second["payload"]) == ["duration"]
+
+
+def test_a_timer_names_the_error_and_keeps_nothing_back(kyt_listener):
+    with kyt.Session(20) as session:
+        timer = session.timed(20, 1)
+        with pytest.raises(KeyError):
+            with timer:
+                raise KeyError("x")
+    assert kyt_listener.wait_for("message")[0]["payload"]["error"] == "KeyError"
+    with pytest.raises(KeyError):  # the session is closed: the caller's error still counts
+        with timer:
+            raise KeyError("x")
+
+
+def test_a_timer_of_coroutines_measures_each_task(kyt_listener):
+    with kyt.Session(20) as session:
+
+        async def main():
+            gate = asyncio.Event()
+
+            @session.timed(20, 3)
+            async def work():
+                await gate.wait()
+
+            tasks = [asyncio.create_task(work()) for _ in range(3)]
+            await asyncio.sleep(0)
+            gate.set()
+            await asyncio.gather(*tasks)
+
+        asyncio.run(main())
+    assert len(kyt_listener.wait_for("message", 3)) == 3
+
+
+def test_a_counter_sends_sums_when_its_interval_is_over(kyt_listener):
+    with kyt.Session(20) as session:
+        every = session.counter(21, 1, interval=0, kind="request")
+        every.add()
+        every.add(2)
+        rest = session.counter(21, 2, interval=3600)
+        threads = [threading.Thread(target=lambda: [rest.add() for _ in range(100)]) for _ in range(4)]
+        for thread in threads:
+            thread.start()
+        for thread in threads:
+            thread.join()
+        assert session.statistics().accepted == 2
+    payloads = [(m["type"], m["payload"]["count"]) for m in kyt_listener.wait_for("message", 3)]
+    assert payloads == [(1, 1), (1, 2), (2, 400)]
+    assert kyt_listener.events("message")[0]["payload"]["kind"] == "request"
+
+
+def test_a_sum_of_nothing_does_not_leave(kyt_listener):
+    with kyt.Session(20) as session:
+        session.counter(21, 1)
+    assert session.statistics().accepted == 0

@@ -1,0 +1,106 @@
+import datetime
+import enum
+
+import pytest
+
+import kytreporting as kyt
+
+
+class Step(enum.IntEnum):
+    FIRST = 1
+
+
+class Word(str, enum.Enum):
+    ONE = "one"
+
+
+def sent(listener, payload):
+    """The payload as the daemon gets it."""
+    before = len(listener.events("message"))
+    with kyt.Session(20) as session:
+        assert session.send(1, 1, payload)
+    return listener.wait_for("message", before + 1)[-1]["payload"]
+
+
+def test_values_of_each_kind_arrive(kyt_listener):
+    moment = datetime.datetime(2026, 11, 22, 12, 0, 0, 250000, tzinfo=datetime.timezone.utc)
+    payload = {
+        "text": "grüße",
+        "empty": "",
+        "int": -3,
+        "most": 2**63 - 1,
+        "least": -(2**63),
+        "unsigned": 2**64 - 1,
+        "float": 0.25,
+        "yes": True,
+        "no": False,
+        "bytes": b"\x00\xff",
+        "bytearray": bytearray(b"\x01"),
+        "moment": moment,
+        "list": [1, "a", True, 2.5, b"\x02", moment, 2**64 - 1, [1], {"b": 2}],
+        "tuple": (1, 2),
+        "mapping": {"inner": {"deep": 1}},
+        "step": Step.FIRST,
+        "word": Word.ONE,
+    }
+    assert sent(kyt_listener, payload) == {
+        "text": "grüße",
+        "empty": "",
+        "int": -3,
+        "most": 2**63 - 1,
+        "least": -(2**63),
+        "unsigned": 2**64 - 1,
+        "float": 0.25,
+        "yes": True,
+        "no": False,
+        "bytes": "00ff",
+        "bytearray": "01",
+        "moment": moment.timestamp(),
+        "list": [1, "a", True, 2.5, "02", moment.timestamp(), 2**64 - 1, [1], {"b": 2}],
+        "tuple": [1, 2],
+        "mapping": {"inner": {"deep": 1}},
+        "step": 1,
+        "word": "one",
+    }
+
+
+def test_none_is_left_out(kyt_listener):
+    assert sent(kyt_listener, {"a": None, "b": 1, "c": {"d": None}}) == {"b": 1, "c": {}}
+
+
+def test_a_half_of_a_surrogate_pair_becomes_a_mark(kyt_listener):
+    assert sent(kyt_listener, {"a": "x\udc80y"}) == {"a": "x?y"}
+
+
+def circle():
+    made = {}
+    made["itself"] = made
+    return made
+
+
+@pytest.mark.parametrize(
+    "payload, text",
+    [
+        ({"a": 2**64}, "64 bits"),
+        ({"a": -(2**63) - 1}, "64 bits"),
+        ({"a": object()}, "a value of the type object cannot be sent"),
+        ({"a": [None]}, "NoneType"),
+        ({"a": {1, 2}}, "set"),
+        ({1: "a"}, "a key of the type int"),
+        ({"a": "x\0y"}, "NUL"),
+        ({"a\0b": 1}, "NUL"),
+        (circle(), "nested too deeply"),
+    ],
+)
+def test_what_cannot_be_sent_is_refused_and_named(kyt_listener, payload, text):
+    with kyt.Session(20) as session:
+        with pytest.raises(kyt.InvalidError, match=text):
+            session.send(1, 1, payload)
+        assert session.statistics().accepted == 0
+
+
+def test_category_and_type_are_whole_numbers(kyt_listener):
+    with kyt.Session(20) as session:
+        for category in (-1, 2**32, 2**70, "1", 1.0):
+            with pytest.raises(kyt.InvalidError, match="whole numbers"):
+                session.send(category, 1)
