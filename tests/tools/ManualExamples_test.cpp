@@ -2,12 +2,16 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <regex>
+#include <utility>
+#include <vector>
 
 #include "platform/linux/confinement/ConfinementProfile.h"
 #include "platform/linux/entitlements/TomlEntitlements.h"
 #include "platform/linux/toml/FlatToml.h"
 #include "platform/linux/toml/TomlSettings.h"
 #include "tests/integration/StageFixture.h"
+#include "tests/support/Eventually.h"
 #include "tests/tools/ManualText.h"
 
 namespace kyt {
@@ -67,6 +71,59 @@ TEST_F(ManualExamplesOnAStage, OfKytctlRun) {
   const ProgramRun defaults = shell(exampleOf("kytctl.1", "sh defaults"));
   EXPECT_EQ(defaults.status, 0) << defaults.text;
   EXPECT_NE(defaults.text.find("environmentType = 2 (integer)\n"), std::string::npos) << defaults.text;
+}
+
+// Each line's label, where it has one, and what follows it, with N in place of numbers.
+std::vector<std::pair<std::string, std::string>> labelsIn(const std::string& text) {
+  constexpr size_t kLabel = 15;
+  std::vector<std::pair<std::string, std::string>> labels;
+  for (const std::string& line : linesOf(text)) {
+    const std::string label = line.substr(0, line.find("  "));
+    if (label.empty() || line.size() <= kLabel) continue;
+    labels.emplace_back(label,
+                        std::regex_replace(line.substr(kLabel), std::regex("[0-9]+([.:][0-9]+)*"), "N"));
+  }
+  return labels;
+}
+
+TEST_F(ManualExamplesOnAStage, OfStatusHasTheLinesThatTheProgramPrints) {
+  TestClient listed(socket(), 7, "example"), unlisted(socket(), 7, "other");
+  for (TestClient* client : {&listed, &unlisted}) {
+    ASSERT_NE(client->configure(), "none");
+    EXPECT_TRUE(client->send(1, 2, {}));
+  }
+  EXPECT_EQ(listed.flush(), "flushed");
+  const auto shown = labelsIn(kytctl({"status"}).text), told = labelsIn(exampleOf("kytctl.1", "status"));
+  ASSERT_EQ(shown.size(), told.size()) << kytctl({"status"}).text;
+  for (size_t i = 0; i < shown.size(); ++i) {
+    EXPECT_EQ(shown[i].first, told[i].first);
+    const bool isOfFigures =
+        told[i].first != "back ends" && told[i].first != "storebags" && told[i].first != "servers";
+    if (isOfFigures) {
+      EXPECT_EQ(shown[i].second, told[i].second);
+    }
+  }
+}
+
+TEST_F(ManualExamplesOnAStage, OfWatchHasTheColumnsThatTheProgramPrints) {
+  const std::vector<std::string> told = linesOf(exampleOf("kytctl.1", "watch"));
+  const TemporaryFolder folder;
+  tools::ChildProcess::Options how;
+  how.outputFile = folder / "output";
+  const auto watch =
+      tools::ChildProcess::start(stage_->program("kytctl"), {"--root", stage_->folder(), "watch"}, how);
+  ASSERT_TRUE(watch);
+  ASSERT_TRUE(eventually([&] { return folder.read("output").ends_with("\n"); }));
+  EXPECT_EQ(linesOf(folder.read("output")).at(0), told.at(0));
+  TestClient client(socket(), 7, "example");
+  ASSERT_EQ(client.configure(), "live: httppost");
+  EXPECT_TRUE(client.send(1, 2, {}));
+  EXPECT_EQ(client.flush(), "flushed");
+  ASSERT_TRUE(eventually([&] { return linesOf(folder.read("output")).size() > 2; }));
+  std::vector<std::string> rows(told.begin() + 1, told.end());
+  rows.push_back(linesOf(folder.read("output")).at(2));
+  const std::regex row(R"([0-9:]{8}  [ 0-9]{7}  .{14}  .{8}  [0-9]+/[0-9]+ {4,10}[a-z-]+(: [a-z0-9-]+)?)");
+  for (const std::string& line : rows) EXPECT_TRUE(std::regex_match(line, row)) << line;
 }
 
 TEST_F(ManualExamplesOnAStage, OfTheStorebagRun) {
