@@ -32,11 +32,6 @@ double secondsAt(const Dictionary& row, const char* key) {
   return std::isfinite(seconds) && std::abs(seconds) < 1e12 ? seconds : 0;
 }
 
-std::string textAt(const Dictionary& row, const char* key) {
-  const String* text = row.string(key);
-  return text != nullptr ? std::string(text->view().substr(0, DepartureTable::kMostNameBytes)) : "";
-}
-
 std::string cut(std::string text) {
   if (text.size() <= DepartureTable::kMostNameBytes) return text;
   text.resize(DepartureTable::kMostNameBytes);
@@ -44,6 +39,11 @@ std::string cut(std::string text) {
   while (!text.empty() && (static_cast<unsigned char>(text.back()) & 0xC0) == 0x80) text.pop_back();
   if (!text.empty() && static_cast<unsigned char>(text.back()) >= 0xC0) text.pop_back();
   return text;
+}
+
+std::string textAt(const Dictionary& row, const char* key) {
+  const String* text = row.string(key);
+  return text != nullptr ? cut(text->str()) : "";
 }
 
 std::optional<DepartureKind> kindNamed(const std::string& name) {

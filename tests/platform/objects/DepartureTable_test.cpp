@@ -95,6 +95,16 @@ TEST(DepartureTable, CutsNoCharacterInTwo) {
             std::string(DepartureTable::kMostNameBytes - 1, 'x'));
 }
 
+TEST(DepartureTable, CutsNoCharacterInTwoOfWhatItReads) {
+  DepartureTable table;
+  table.add(departure("a"), kNow);
+  Dictionary object = table.object(), row = *(*object.array("rows"))[0].dictionary();
+  row.set("clientName", std::string(DepartureTable::kMostNameBytes - 1, 'x') + "\xC3\xA4");
+  object.set("rows", Array{row});
+  EXPECT_EQ(DepartureTable::of(Value(object)).rows().begin()->first.program.clientName,
+            std::string(DepartureTable::kMostNameBytes - 1, 'x'));
+}
+
 TEST(DepartureTable, ReadsBackWhatItWrites) {
   DepartureTable table(kNow - 5);
   table.add(departure("a", 3, false), kNow);
