@@ -15,14 +15,9 @@
 #include "kytreporting/KYTReporting.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/support/TemporaryFolder.h"
 
-// A forked child of a process with threads is nothing that the thread sanitizer follows.
-#if defined(__has_feature)
-#if __has_feature(thread_sanitizer)
-#define KYT_NO_FORK_TEST 1
-#endif
-#endif
 #ifndef KYT_NO_FORK_TEST
 
 namespace kyt {

@@ -25,6 +25,8 @@
 #include "tests/client/AnswerOf.h"
 #include "tests/client/TestDaemon.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/RandomRuns.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -32,11 +34,6 @@ namespace {
 
 using Statistics = KYTReporting::Statistics;
 using std::chrono::milliseconds;
-
-unsigned numberFrom(const char* variable, unsigned otherwise) {
-  const char* text = std::getenv(variable);
-  return text != nullptr ? static_cast<unsigned>(std::strtoul(text, nullptr, 10)) : otherwise;
-}
 
 uint64_t lostAfterAcceptance(const Statistics& figures) {
   return figures.lostOnConnectionEnd + figures.lostInQueue + figures.droppedUnsendable +
@@ -251,14 +248,7 @@ class RandomRun {
 };
 
 TEST(StatisticsOfRandomSessions, CloseWhateverHappens) {
-  const unsigned runs = numberFrom("KYT_STATISTICS_RUNS", 25);
-  const unsigned first = numberFrom("KYT_STATISTICS_SEED", std::random_device()());
-  RecordProperty("first seed", std::to_string(first));
-  for (unsigned i = 0; i < runs; ++i) {
-    SCOPED_TRACE("KYT_STATISTICS_SEED=" + std::to_string(first + i) + " KYT_STATISTICS_RUNS=1");
-    RandomRun(first + i).go();
-    if (testing::Test::HasFailure()) return;
-  }
+  RandomRuns("KYT_STATISTICS", 25).each([](unsigned seed) { RandomRun(seed).go(); });
 }
 
 class ClientStatistics : public testing::Test {
@@ -406,11 +396,6 @@ TEST_F(ClientStatistics, OfTheProcessAreToldInCToo) {
   kyt_total_statistics(nullptr);
 }
 
-#if defined(__has_feature)
-#if __has_feature(thread_sanitizer)
-#define KYT_NO_FORK_TEST 1
-#endif
-#endif
 #ifndef KYT_NO_FORK_TEST
 TEST_F(ClientStatistics, BeginAtZeroInAForkedChild) {
   auto session = KYTReporting::open(options());

@@ -20,6 +20,7 @@
 #include "platform/objects/Keys.h"
 #include "session/ReportingdSession.h"
 #include "session/ReportingdSessionClass.h"
+#include "tests/support/RandomRuns.h"
 #include "tests/support/RecordingMessageLog.h"
 #include "tests/support/SignedBag.h"
 #include "tests/support/TestPlatform.h"
@@ -28,11 +29,6 @@ namespace kyt {
 namespace {
 
 constexpr int kWithQDX = 7, kWithoutQDX = 20, kWithoutStorebag = 2;
-
-unsigned numberFrom(const char* variable, unsigned otherwise) {
-  const char* text = std::getenv(variable);
-  return text != nullptr ? static_cast<unsigned>(std::strtoul(text, nullptr, 10)) : otherwise;
-}
 
 // Of one program and back end, as the test knows it.
 struct Expected {
@@ -428,14 +424,7 @@ class RandomRun {
 };
 
 TEST(BooksOfRandomSessions, CloseWhateverHappens) {
-  const unsigned runs = numberFrom("KYT_BOOKS_RUNS", 150);
-  const unsigned first = numberFrom("KYT_BOOKS_SEED", std::random_device()());
-  RecordProperty("first seed", std::to_string(first));
-  for (unsigned i = 0; i < runs; ++i) {
-    SCOPED_TRACE("KYT_BOOKS_SEED=" + std::to_string(first + i) + " KYT_BOOKS_RUNS=1");
-    RandomRun(first + i).go();
-    if (HasFailure()) return;
-  }
+  RandomRuns("KYT_BOOKS", 150).each([](unsigned seed) { RandomRun(seed).go(); });
 }
 
 }  // namespace

@@ -18,14 +18,10 @@
 #include "platform/base/Counters.h"
 #include "tests/integration/StageFixture.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/RandomRuns.h"
+#include "tests/support/Sanitizers.h"
 #include "tools/demo/ChildProcess.h"
 
-// A forked child of a process with threads is nothing that the thread sanitizer follows.
-#if defined(__has_feature)
-#if __has_feature(thread_sanitizer)
-#define KYT_NO_FORK_TEST 1
-#endif
-#endif
 #ifndef KYT_NO_FORK_TEST
 
 namespace kyt {
@@ -34,11 +30,6 @@ namespace {
 using std::chrono::milliseconds;
 
 constexpr int kWithStorebag = 20, kWithoutStorebag = 2;
-
-unsigned numberFrom(const char* variable, unsigned otherwise) {
-  const char* text = std::getenv(variable);
-  return text != nullptr ? static_cast<unsigned>(std::strtoul(text, nullptr, 10)) : otherwise;
-}
 
 class Draw {
  public:
@@ -337,15 +328,9 @@ class BooksOfProcesses : public StageTest {
 };
 
 TEST_F(BooksOfProcesses, CloseAndJoinWhateverHappens) {
-  const unsigned runs = numberFrom("KYT_PROCESS_BOOKS_RUNS", 4);
-  const unsigned first = numberFrom("KYT_PROCESS_BOOKS_SEED", std::random_device()());
-  RecordProperty("first seed", std::to_string(first));
-  for (unsigned i = 0; i < runs; ++i) {
-    SCOPED_TRACE("KYT_PROCESS_BOOKS_SEED=" + std::to_string(first + i) + " KYT_PROCESS_BOOKS_RUNS=1");
-    run(first + i);
-    if (HasFailure()) return;
-  }
-  printSums(runs, first);
+  const RandomRuns runs("KYT_PROCESS_BOOKS", 4);
+  runs.each([this](unsigned seed) { run(seed); });
+  if (!HasFailure()) printSums(runs.count, runs.first);
 }
 
 }  // namespace

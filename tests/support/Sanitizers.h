@@ -17,3 +17,10 @@ inline constexpr bool kSanitized = false;
 #endif
 
 }  // namespace kyt
+
+// A forked child of a process with threads is nothing that the thread sanitizer follows.
+#if defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define KYT_NO_FORK_TEST 1
+#endif
+#endif
