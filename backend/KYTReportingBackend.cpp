@@ -108,10 +108,12 @@ void KYTReportingBackend::eventDelivered() const {
 
 void KYTReportingBackend::tellWatchers(const Tally& tally, EventKind kind,
                                        std::optional<Reason> dropped) const {
+  Watchers& watchers = *platform_.books.watchers();
+  if (!watchers.want(tally.program(), kind)) return;
   PassedEvent event = tally.passed(kind, dropped);
   event.backEnd = name_.str();
   if (dropped) event.rule = ruleFor(*dropped, kind);
-  platform_.books.watchers()->tell(std::move(event));
+  watchers.tell(std::move(event));
 }
 
 const char* KYTReportingBackend::ruleFor(Reason fate, EventKind kind) const {

@@ -14,8 +14,7 @@
 namespace kyt::bench {
 namespace {
 
-void socketlessEventToBatch(Rounds& rounds) {
-  Pipeline pipeline;
+void fillBatches(Rounds& rounds, Pipeline& pipeline) {
   if (!pipeline.isLive()) return rounds.fail("no back end is live");
   size_t events = 0;
   while (rounds.more()) {
@@ -27,7 +26,28 @@ void socketlessEventToBatch(Rounds& rounds) {
   if (pipeline.batchedBytes() < Pipeline::kEvents * 100) rounds.fail("the events did not arrive");
   rounds.setItems(events);
 }
+
+void socketlessEventToBatch(Rounds& rounds) {
+  Pipeline pipeline;
+  fillBatches(rounds, pipeline);
+}
 KYT_MEASURE(socketlessEventToBatch);
+
+// The same without the books: what is left is what they cost.
+void eventThatNobodyBooks(Rounds& rounds) {
+  Pipeline pipeline;
+  pipeline.stopBooking();
+  fillBatches(rounds, pipeline);
+}
+KYT_MEASURE(eventThatNobodyBooks);
+
+// The same while somebody watches and reads nothing. The batch is given up, so every event is one to be told.
+void eventBesideADeafWatcher(Rounds& rounds) {
+  Pipeline pipeline;
+  const std::unique_ptr<Watcher> deaf = pipeline.watch();
+  fillBatches(rounds, pipeline);
+}
+KYT_MEASURE(eventBesideADeafWatcher);
 
 void decodeAlone(Rounds& rounds) {
   std::vector<std::string> calls;

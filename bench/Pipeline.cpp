@@ -76,6 +76,10 @@ size_t Pipeline::postBatch() {
   return requests == 0 ? 0 : test_.urlSessions.lastRequest().body.size();
 }
 
+void Pipeline::stopBooking() {
+  session_->backendForKey(kKYTReportingBackendHTTPPost)->setProgram(nullptr);
+}
+
 void Pipeline::discardBatch() {
   KYTReportingBackend& backend = *session_->backendForKey(kKYTReportingBackendHTTPPost);
   backend.setState(kBackendStateHeld);

@@ -33,6 +33,10 @@ class Pipeline final : private ListenerDelegate {
   [[nodiscard]] size_t postBatch();
   // Gives the batch up.
   void discardBatch();
+  // From now on events are counted and not booked.
+  void stopBooking();
+  // Somebody who watches all events, and reads none but by himself.
+  [[nodiscard]] std::unique_ptr<Watcher> watch() { return test_.books.watchers()->watch({}); }
   // What the events in the batch take by the health report's estimate.
   [[nodiscard]] uint64_t batchedBytes() const { return session_->batchedEventsSize(); }
 

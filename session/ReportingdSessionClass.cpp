@@ -51,7 +51,7 @@ std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdSessionClass::sing
 
 void ReportingdSessionClass::tellWatchers(const Tally& tally, EventKind kind, Reason fate) const {
   const std::shared_ptr<Watchers>& watchers = platform().books.watchers();
-  if (!watchers->anybody()) return;
+  if (!watchers->anybody() || !watchers->want(tally.program(), kind)) return;
   PassedEvent event = tally.passed(kind, fate);
   event.backEnd = kNoBackEnd;
   watchers->tell(std::move(event));

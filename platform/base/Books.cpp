@@ -300,8 +300,9 @@ void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
   const bool isPosted = shown_->post != nullptr && shown_->post->number() != 0;
   for (size_t i = 0; i < size_; ++i) {
     const Tally* tally = tallies.next();
-    if (tally == nullptr) continue;
-    PassedEvent event = tally->passed(i < shown_->kinds.size() ? shown_->kinds[i] : EventKind(), dropped);
+    const EventKind kind = i < shown_->kinds.size() ? shown_->kinds[i] : EventKind();
+    if (tally == nullptr || !shown_->watchers->want(tally->program(), kind)) continue;
+    PassedEvent event = tally->passed(kind, dropped);
     event.backEnd = shown_->backEnd;
     if (dropped) event.rule = shown_->rule;
     if (isPosted) event.post = shown_->post;

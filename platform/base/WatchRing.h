@@ -39,6 +39,13 @@ class WatchRing {
     }
   }
 
+  // Whether a put now would be taken, if nobody else puts before.
+  [[nodiscard]] bool hasRoom() const {
+    const size_t number = puts_.load(std::memory_order_relaxed);
+    const size_t turn = places_[number & mask_].turn.load(std::memory_order_acquire);
+    return static_cast<std::ptrdiff_t>(turn - number) >= 0;
+  }
+
   // Null: there is none, or it is being put at this moment.
   [[nodiscard]] std::shared_ptr<const T> take() {
     Place& place = places_[takes_ & mask_];

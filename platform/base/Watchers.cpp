@@ -14,9 +14,9 @@ struct Watchers::Ring {
   std::atomic<uint64_t> lost{0};
 };
 
-bool WatchFilter::admits(const PassedEvent& event) const {
-  return (!user || *user == event.program.user) && (!client || *client == event.program.clientName) &&
-         (!category || *category == event.kind.category);
+bool WatchFilter::admits(const ReportingProgram& program, EventKind kind) const {
+  return (!user || *user == program.user) && (!client || *client == cutName(program.clientName)) &&
+         (!category || *category == kind.category);
 }
 
 WatchedPost::~WatchedPost() {
@@ -51,20 +51,32 @@ std::unique_ptr<Watcher> Watchers::watch(WatchFilter filter) {
 
 // Whoever tells says so before it looks at the ring, and whoever takes the ring away looks for tellers afterwards: so one of
 // the two sees the other. Who finds no ring at first stays out, so that there is an end to the wait.
-void Watchers::tell(PassedEvent event) {
-  event.program.clientName = cutName(event.program.clientName);
-  event.program.service = cutName(event.program.service);
-  std::shared_ptr<const PassedEvent> shared;
+template <typename Use>
+void Watchers::forEachRing(const ReportingProgram& program, EventKind kind, Use use) {
   for (Place& place : places_) {
     if (place.ring.load(std::memory_order_relaxed) == nullptr) continue;
     place.tellers.fetch_add(1);
     Ring* ring = place.ring.load();
-    if (ring != nullptr && ring->filter.admits(shared != nullptr ? *shared : event)) {
-      if (shared == nullptr) shared = std::make_shared<const PassedEvent>(std::move(event));
-      if (!ring->events.put(shared)) ring->lost.fetch_add(1, std::memory_order_relaxed);
-    }
+    if (ring != nullptr && ring->filter.admits(program, kind)) use(*ring);
     place.tellers.fetch_sub(1);
   }
+}
+
+bool Watchers::want(const ReportingProgram& program, EventKind kind) {
+  bool hasRoom = false;
+  forEachRing(program, kind, [&hasRoom](const Ring& ring) { hasRoom = hasRoom || ring.events.hasRoom(); });
+  if (!hasRoom)
+    forEachRing(program, kind, [](Ring& ring) { ring.lost.fetch_add(1, std::memory_order_relaxed); });
+  return hasRoom;
+}
+
+void Watchers::tell(PassedEvent event) {
+  event.program.clientName = cutName(event.program.clientName);
+  event.program.service = cutName(event.program.service);
+  const auto shared = std::make_shared<const PassedEvent>(std::move(event));
+  forEachRing(shared->program, shared->kind, [&shared](Ring& ring) {
+    if (!ring.events.put(shared)) ring.lost.fetch_add(1, std::memory_order_relaxed);
+  });
 }
 
 bool Watchers::takeRoom(size_t bytes) {

@@ -74,7 +74,8 @@ struct WatchFilter {
   std::optional<std::string> client = std::nullopt;  // the name, as the books have it
   std::optional<uint16_t> category = std::nullopt;
   bool bodies = false;
-  [[nodiscard]] bool admits(const PassedEvent& event) const;
+  // `program` as it is, or with its names cut.
+  [[nodiscard]] bool admits(const ReportingProgram& program, EventKind kind) const;
 };
 
 // One watcher's end. One thread at a time. Its destructor waits for those who tell it something at that moment.
@@ -109,6 +110,9 @@ class Watchers : public std::enable_shared_from_this<Watchers> {
 
   // Asked before anything is made for telling.
   [[nodiscard]] bool anybody() const { return watching_.load(std::memory_order_relaxed) != 0; }
+  // Whether somebody whose filter lets such an event through has room for it: asked before it is made. Where none has, it
+  // counts as lost to them.
+  [[nodiscard]] bool want(const ReportingProgram& program, EventKind kind);
   void tell(PassedEvent event);
 
  private:
@@ -119,6 +123,9 @@ class Watchers : public std::enable_shared_from_this<Watchers> {
     std::atomic<Ring*> ring{nullptr};
     std::atomic<uint32_t> tellers{0};  // that may be using it
   };
+  // Calls `use` with each ring whose filter lets it through, which is not taken away meanwhile.
+  template <typename Use>
+  void forEachRing(const ReportingProgram& program, EventKind kind, Use use);
   [[nodiscard]] bool wantsBodies() const { return wantingBodies_.load(std::memory_order_relaxed) != 0; }
   [[nodiscard]] bool takeRoom(size_t bytes);
   void end(size_t place, bool bodies);

@@ -77,6 +77,35 @@ TEST_F(WatchersTest, CountWhatFindsNoRoomAndKeepTheOldest) {
   EXPECT_NE(idle->next(), nullptr);
 }
 
+TEST_F(WatchersTest, WantAnEventWhereOneOfThemHasRoomAndLoseItOtherwise) {
+  const ReportingProgram a{1000, 7, "a", "s"}, b{1000, 7, "b", "s"};
+  EXPECT_FALSE(watchers_->want(a, {1, 1})) << "nobody watches";
+  const auto full = watchers_->watch({.client = "a"});
+  EXPECT_FALSE(watchers_->want(b, {1, 1})) << "nobody asked for it";
+  EXPECT_TRUE(watchers_->want(a, {1, 1}));
+  for (size_t i = 0; i < Limits::maxWatchedEvents; ++i) watchers_->tell(event(1));
+  EXPECT_EQ(full->takeLost(), 0U);
+  EXPECT_FALSE(watchers_->want(a, {1, 1}));
+  EXPECT_FALSE(watchers_->want(b, {1, 1}));
+  EXPECT_EQ(full->takeLost(), 1U);
+  const auto quick = watchers_->watch({});
+  EXPECT_TRUE(watchers_->want(a, {1, 1})) << "who has room is told, and the other loses it then";
+  EXPECT_EQ(full->takeLost(), 0U);
+  watchers_->tell(event(1));
+  EXPECT_EQ(full->takeLost(), 1U);
+  EXPECT_NE(full->next(), nullptr);
+  EXPECT_TRUE(watchers_->want(a, {1, 1})) << "it has read one";
+  EXPECT_EQ(full->takeLost() + quick->takeLost(), 0U);
+}
+
+TEST_F(WatchersTest, KnowProgramsByNamesThatAreLongerThanTheBooksKeep) {
+  const std::string name(Limits::maxBookNameBytes + 9, 'n');
+  const auto watcher = watchers_->watch({.client = std::string(cutName(name))});
+  EXPECT_TRUE(watchers_->want({1000, 7, name, "s"}, {1, 1}));
+  watchers_->tell(event(1, 1000, name));
+  EXPECT_NE(watcher->next(), nullptr);
+}
+
 TEST_F(WatchersTest, CutNamesAsTheBooksDo) {
   const auto watcher = watchers_->watch({});
   watchers_->tell(event(1, 1, std::string(Limits::maxBookNameBytes + 9, 'n')));
@@ -143,7 +172,10 @@ TEST_F(WatchersTest, LoseNothingUncountedHoweverManyTell) {
   std::atomic<uint32_t> done{0};
   for (uint32_t user = 0; user < kTellers; ++user)
     tellers.emplace_back([this, user, &done] {
-      for (uint32_t i = 0; i < kEach; ++i) watchers_->tell(event(static_cast<int32_t>(i), user));
+      for (uint32_t i = 0; i < kEach; ++i) {
+        const PassedEvent passed = event(static_cast<int32_t>(i), user);
+        if (user % 2 == 0 || watchers_->want(passed.program, passed.kind)) watchers_->tell(passed);
+      }
       ++done;
     });
   uint64_t told = 0;
