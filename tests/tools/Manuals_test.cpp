@@ -54,10 +54,13 @@ TEST_P(ManualOf, NamesTheProgramsOptionsAndNoOthers) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Programs, ManualOf,
-                         ::testing::Values("kytreportingd.8", "kytdevserver.1", "kytfeed.1", "kytdemo.1"),
+                         ::testing::Values("kytreportingd.8", "kytdevserver.1", "kytfeed.1", "kytdemo.1",
+                                           "kytsource-units.8"),
                          [](const auto& test) {
-                           const std::string page = test.param;
-                           return page.substr(0, page.find('.'));
+                           std::string page = test.param;
+                           page = page.substr(0, page.find('.'));
+                           std::erase(page, '-');
+                           return page;
                          });
 
 TEST(DevelopmentServersGuide, NamesEachOption) {

@@ -1,0 +1,71 @@
+// What the sources share that read the journal: it follows the entries that a program asked for, sums them up, and hands
+// the sum over once a period. One thread.
+//
+// What is read and not delivered is read again after a restart, from the state's position on, so nothing is lost; what
+// was delivered is not told again. After a hard end between the two a report comes once more, with the same number and
+// at least the same contents.
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "sources/Journal.h"
+#include "sources/State.h"
+#include "sources/Summary.h"
+
+namespace kyt::sources {
+
+// One thing found in an entry, told apart from others by its fields.
+struct Finding {
+  uint32_t type = 0;
+  Dictionary fields;
+};
+using FieldReader = std::function<std::string(const char* name)>;
+using Finder = std::function<std::optional<Finding>(const FieldReader& field)>;
+// Which of the events were taken.
+using Deliver = std::function<std::vector<bool>(const std::vector<SourceEvent>&)>;
+
+class Follower {
+ public:
+  struct Options {
+    std::string stateFile;
+    uint32_t category = 0;
+    // Processor time of one look. What it leaves is read at the next one.
+    std::chrono::microseconds lookBudget = std::chrono::milliseconds(25);
+    // A look that is behind by more goes on at the present, and counts what it passed over.
+    std::chrono::seconds mostBehind = std::chrono::minutes(15);
+  };
+  // `now` is in microseconds since 1970. Without a state file it begins at the present.
+  Follower(Journal& journal, Options options, Finder finder, Deliver deliver, std::function<uint64_t()> now);
+
+  void look();
+  // Whether the last look left entries unread.
+  [[nodiscard]] bool isBehind() const { return behind_; }
+  [[nodiscard]] bool hasFindings() const { return !summary_.empty(); }
+  // Whether all was taken. What was not waits, and grows by no more than the summary's bounds.
+  [[nodiscard]] bool report();
+  // Why the state could not be written, last; empty: it could.
+  [[nodiscard]] const std::string& stateProblem() const { return stateProblem_; }
+
+ private:
+  void begin();
+  void take();
+  void goToThePresent();
+  void writeDown();
+
+  Journal& journal_;
+  const Options options_;
+  const Finder finder_;
+  const Deliver deliver_;
+  const std::function<uint64_t()> now_;
+  Summary summary_;
+  State state_;
+  std::string stateProblem_;
+  std::optional<CursorPlace> unreadFrom_;  // entries from here to the next one that is read count as unread
+  bool behind_ = false;
+};
+
+}  // namespace kyt::sources

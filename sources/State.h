@@ -1,0 +1,24 @@
+// How far a source has reported: a file of two lines, replaced as a whole, so that a crash at any point leaves the old
+// one or the new one. One thread.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace kyt::sources {
+
+struct State {
+  // Of the next report. One that is made again after a hard end has the number of the first.
+  uint64_t report = 1;
+  // Where the journal was read to: a cursor, or "@" and microseconds since 1970 before anything was found.
+  std::string position;
+  friend bool operator==(const State&, const State&) = default;
+};
+
+// None: there is no such file yet, or it holds nothing that a source wrote.
+[[nodiscard]] std::optional<State> readState(const std::string& path);
+// Why it could not be written. Its folder is there.
+[[nodiscard]] std::optional<std::string> writeState(const std::string& path, const State& state);
+
+}  // namespace kyt::sources

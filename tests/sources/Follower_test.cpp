@@ -1,0 +1,233 @@
+// Following a journal: nothing is lost, nothing is told twice, and a flood costs no more than its share.
+#include "sources/Follower.h"
+
+#include <gtest/gtest.h>
+
+#include "sources/units/UnitFindings.h"
+#include "tests/sources/WrittenJournal.h"
+
+namespace kyt::sources {
+namespace {
+
+using std::chrono::microseconds;
+using std::chrono::seconds;
+
+class FollowedJournal : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!WrittenJournal::canBeWritten()) GTEST_SKIP() << "systemd-journal-remote is not installed";
+    units_.write("cron.service", "");
+    units_.write("ssh.service", "");
+    written_.add(anyLine("before"));
+    written_.add(failureOf("ssh.service"));
+    written_.write();
+    now_ = written_.nextTime();
+  }
+  // As a program that starts.
+  void start() {
+    follower_.reset();
+    auto opened = Journal::open({written_.folder(), true, unitsProgram().matches});
+    ASSERT_TRUE(std::holds_alternative<std::unique_ptr<Journal>>(opened)) << std::get<std::string>(opened);
+    journal_ = std::get<std::unique_ptr<Journal>>(std::move(opened));
+    Follower::Options options;
+    options.stateFile = state_ / "state";
+    options.category = 301;
+    options.lookBudget = budget_;
+    follower_ = std::make_unique<Follower>(
+        *journal_, options, unitsProgram().finder({units_.path()}),
+        [this](const std::vector<SourceEvent>& events) {
+          if (!daemonIsThere_) return std::vector<bool>(events.size(), false);
+          delivered_.insert(delivered_.end(), events.begin(), events.end());
+          return std::vector<bool>(events.size(), true);
+        },
+        [this] { return now_; });
+  }
+  void look() {
+    journal_->takeNews();
+    follower_->look();
+  }
+  // What was delivered since the last call: "type unit count" of each event.
+  std::vector<std::string> told() {
+    std::vector<std::string> lines;
+    for (const SourceEvent& event : delivered_) {
+      const String* unit = event.payload.string("unit");
+      lines.push_back(std::to_string(event.type) + " " + (unit != nullptr ? unit->str() : "-") + " " +
+                      std::to_string(event.payload.integer("count")));
+    }
+    delivered_.clear();
+    return lines;
+  }
+  using Lines = std::vector<std::string>;
+
+  WrittenJournal written_;
+  TemporaryFolder units_, state_;
+  microseconds budget_ = seconds(60);
+  bool daemonIsThere_ = true;
+  uint64_t now_ = 0;
+  std::vector<SourceEvent> delivered_;
+  std::unique_ptr<Journal> journal_;
+  std::unique_ptr<Follower> follower_;
+};
+
+TEST_F(FollowedJournal, TellsNothingOfWhatWasThereBeforeTheFirstStart) {
+  start();
+  look();
+  EXPECT_FALSE(follower_->hasFindings());
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines());
+}
+
+TEST_F(FollowedJournal, TellsWhatTheServiceManagerWroteAlone) {
+  start();
+  written_.add(failureOf("cron.service"));
+  auto forged = failureOf("ssh.service");
+  forged[0].second = "4711";  // whoever writes with the same identifier
+  written_.add(forged);
+  written_.add(restartOf("cron.service"));
+  written_.add(failureOf("cron.service"));
+  written_.add(failureOf("cron.service", "Alice's result"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), (Lines{"1 cron.service 2", "1 cron.service 1", "2 cron.service 1"}));
+}
+
+TEST_F(FollowedJournal, TellsNothingTwiceAndLosesNothingOverRestarts) {
+  start();
+  written_.add(failureOf("cron.service"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 cron.service 1"});
+  // Written while the program does not run.
+  follower_.reset();
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  start();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 ssh.service 1"});
+  start();
+  look();
+  EXPECT_FALSE(follower_->hasFindings());
+}
+
+TEST_F(FollowedJournal, KeepsWhatWasReadBeforeTheFirstFinding) {
+  start();
+  start();  // nothing was found in between
+  written_.add(failureOf("cron.service"));
+  written_.write();
+  start();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 cron.service 1"});
+}
+
+TEST_F(FollowedJournal, WaitsForTheDaemonWithoutGrowingAndCountsIt) {
+  start();
+  daemonIsThere_ = false;
+  for (int i = 0; i < 3; ++i) {
+    written_.add(failureOf("cron.service"));
+    written_.write();
+    look();
+    EXPECT_FALSE(follower_->report());
+  }
+  daemonIsThere_ = true;
+  EXPECT_TRUE(follower_->report());
+  ASSERT_EQ(delivered_.size(), 2U);
+  EXPECT_EQ(delivered_[1].payload.integer("waits"), 3);
+  EXPECT_EQ(told(), (Lines{"1 cron.service 3", "9 - 0"}));
+}
+
+TEST_F(FollowedJournal, ReadsAgainAfterARestartWhatFoundNoDaemon) {
+  start();
+  daemonIsThere_ = false;
+  written_.add(failureOf("cron.service"));
+  written_.write();
+  look();
+  EXPECT_FALSE(follower_->report());
+  daemonIsThere_ = true;
+  start();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 cron.service 1"});
+}
+
+TEST_F(FollowedJournal, NumbersReportsOnOverRestarts) {
+  std::vector<int> numbers;
+  for (int i = 0; i < 3; ++i) {
+    start();
+    written_.add(failureOf("cron.service"));
+    written_.write();
+    look();
+    EXPECT_TRUE(follower_->report());
+    for (const SourceEvent& event : delivered_) numbers.push_back(event.payload.integer("report"));
+    delivered_.clear();
+  }
+  EXPECT_EQ(numbers, (std::vector<int>{1, 2, 3}));
+}
+
+TEST_F(FollowedJournal, GivesALookThatTakesTooLongUpAndCountsTheRestAtTheNext) {
+  budget_ = microseconds(0);
+  start();
+  constexpr int kFlood = 500;
+  for (int i = 0; i < kFlood; ++i) written_.add(failureOf("cron.service"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->isBehind());
+  int looks = 1;
+  for (; follower_->isBehind() && looks < kFlood; ++looks) look();
+  EXPECT_GT(looks, 10);
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 cron.service 500"});
+}
+
+TEST_F(FollowedJournal, GoesOnAtThePresentWhereItIsFarBehindAndCountsWhatItPassedOver) {
+  budget_ = microseconds(0);
+  start();
+  for (int i = 0; i < 100; ++i) written_.add(failureOf("cron.service"));
+  written_.write();
+  look();
+  ASSERT_TRUE(follower_->isBehind());
+  now_ += 3'600'000'000;
+  look();
+  EXPECT_FALSE(follower_->isBehind());
+  written_.setNextTime(now_ + 1);
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->report());
+  ASSERT_EQ(delivered_.size(), 3U);
+  // 16 were read; the first one of those passed over is the 17th.
+  EXPECT_EQ(delivered_[2].payload.integer("entriesNotRead"), 84);
+  EXPECT_EQ(told(), (Lines{"1 cron.service 16", "1 ssh.service 1", "9 - 0"}));
+}
+
+TEST_F(FollowedJournal, SaysThatSomethingIsGoneWhereTheJournalWasCleanedUpMeanwhile) {
+  start();
+  written_.add(failureOf("cron.service"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines{"1 cron.service 1"});
+  follower_.reset();
+  journal_.reset();
+  written_.removeFile("system.journal");
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  start();
+  look();
+  EXPECT_TRUE(follower_->report());
+  ASSERT_EQ(delivered_.size(), 2U);
+  EXPECT_GE(delivered_[1].payload.integer("entriesNotRead"), 1);
+  EXPECT_EQ(told(), (Lines{"1 ssh.service 1", "9 - 0"}));
+}
+
+TEST_F(FollowedJournal, IsNoJournalWhereTheFolderIsMissing) {
+  const auto opened = Journal::open({written_.folder() + "/none", true, {}});
+  ASSERT_TRUE(std::holds_alternative<std::string>(opened));
+  EXPECT_EQ(std::get<std::string>(opened), "can't open the journal: No such file or directory");
+}
+
+}  // namespace
+}  // namespace kyt::sources

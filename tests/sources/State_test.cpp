@@ -1,0 +1,36 @@
+// The file that says how far a source has reported.
+#include "sources/State.h"
+
+#include <gtest/gtest.h>
+
+#include "tests/support/TemporaryFolder.h"
+
+namespace kyt::sources {
+namespace {
+
+TEST(SourceState, IsReadAsItWasWritten) {
+  const TemporaryFolder folder;
+  const State state{42, "s=12;i=3;t=5"};
+  EXPECT_EQ(writeState(folder / "state", state), std::nullopt);
+  EXPECT_EQ(readState(folder / "state"), state);
+  EXPECT_EQ(writeState(folder / "state", State{43, ""}), std::nullopt);
+  EXPECT_EQ(readState(folder / "state"), (State{43, ""}));
+}
+
+TEST(SourceState, IsNoneWhereTheFileHoldsSomethingElse) {
+  const TemporaryFolder folder;
+  EXPECT_EQ(readState(folder / "none"), std::nullopt);
+  for (const char* text : {"", "1", "1\ncursor", "x\ncursor\n", "1x\ncursor\n", "1\na\nb\n"}) {
+    EXPECT_EQ(readState(folder.write("state", text)), std::nullopt) << text;
+  }
+}
+
+TEST(SourceState, SaysWhyItCannotBeWritten) {
+  const TemporaryFolder folder;
+  const auto problem = writeState(folder / "missing/state", {});
+  ASSERT_TRUE(problem);
+  EXPECT_EQ(*problem, "can't write " + (folder / "missing/state") + ": No such file or directory");
+}
+
+}  // namespace
+}  // namespace kyt::sources

@@ -1,0 +1,56 @@
+// What a report says: equal findings once, with their number, and never more rows than its bound.
+#include "sources/Summary.h"
+
+#include <gtest/gtest.h>
+
+namespace kyt::sources {
+namespace {
+
+constexpr uint64_t kSecond = 1'000'000;
+
+TEST(Summary, CountsEqualFindingsInOneRowWithTheirFirstAndLastTime) {
+  Summary summary(301);
+  summary.add(1, {{"unit", "a.service"}}, 20 * kSecond);
+  summary.add(1, {{"unit", "a.service"}}, 10 * kSecond);
+  summary.add(2, {{"unit", "a.service"}}, 30 * kSecond);
+  const auto events = summary.events(7);
+  ASSERT_EQ(events.size(), 2U);
+  EXPECT_EQ(events[0].category, 301U);
+  EXPECT_EQ(events[0].type, 1U);
+  EXPECT_EQ(events[0].payload,
+            (Dictionary{{"unit", "a.service"}, {"count", 2}, {"first", 10}, {"last", 20}, {"report", 7}}));
+  EXPECT_EQ(events[1].type, 2U);
+}
+
+TEST(Summary, CountsWhatFindsNoRowOfItsOwn) {
+  Summary summary(301);
+  for (size_t i = 0; i < Summary::kMostRows + 50; ++i) summary.add(1, {{"unit", std::to_string(i)}}, kSecond);
+  const auto events = summary.events(1);
+  ASSERT_EQ(events.size(), Summary::kMostRows + 1);
+  EXPECT_EQ(events.back().type, Summary::kNotTold);
+  EXPECT_EQ(events.back().payload.integer("withoutRow"), 50);
+}
+
+TEST(Summary, ForgetsWhatWasDeliveredAlone) {
+  Summary summary(301);
+  summary.add(1, {{"unit", "a.service"}}, kSecond);
+  summary.add(1, {{"unit", "b.service"}}, kSecond);
+  summary.addUnread(5);
+  summary.forget({true, false, true});
+  const auto events = summary.events(1);
+  ASSERT_EQ(events.size(), 1U);
+  EXPECT_EQ(*events[0].payload.string("unit"), "b.service");
+  summary.forget({true});
+  EXPECT_TRUE(summary.empty());
+}
+
+TEST(Summary, KeepsAllWhereNothingWasDelivered) {
+  Summary summary(301);
+  summary.add(1, {{"unit", "a.service"}}, kSecond);
+  summary.addUnread(5);
+  summary.forget({});
+  EXPECT_EQ(summary.events(1).size(), 2U);
+}
+
+}  // namespace
+}  // namespace kyt::sources
