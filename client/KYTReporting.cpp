@@ -3,7 +3,10 @@
 #include <cstdlib>
 #include <utility>
 
+#include "client/Connection.h"
+#include "client/LastWord.h"
 #include "client/Loop.h"
+#include "client/Output.h"
 #include "client/Session.h"
 
 namespace kyt {
@@ -51,32 +54,54 @@ std::unique_ptr<Command> command(Call call) {
   return std::make_unique<Command>(std::move(call));
 }
 
-std::shared_ptr<client::Session> makeSession(KYTReporting::Options options, bool single) {
+std::shared_ptr<client::Session> makeSession(KYTReporting::Options options, bool single,
+                                             const KYTReporting::Behaviour& behaviour = {}) {
   chooseSocket(options);
   client::Loop* loop = client::Loop::current();
-  auto session = std::make_shared<client::Session>(std::move(options), loop, single);
+  auto session = std::make_shared<client::Session>(std::move(options), loop, single, behaviour);
   return session;
 }
 
 }  // namespace
 
+std::optional<linux_client::LastSocket> client::lastWord(KYTReporting::Options options, uint32_t category,
+                                                         uint32_t type, std::optional<Dictionary> payload) {
+  if (!inRange(category, type) || KYTReporting::checkSessionInfo(options.sessionInfo)) return std::nullopt;
+  chooseSocket(options);
+  Call call{Method::sendMessageWithSessionInfo,
+            SingleMessageArguments{std::move(options.sessionInfo), std::move(options.userInfo),
+                                   static_cast<uint16_t>(category), static_cast<uint16_t>(type),
+                                   std::move(payload)}};
+  Output output;
+  output.restart(Connection::opening());
+  if (!output.call(call, false)) return std::nullopt;
+  return linux_client::LastSocket::make(options.socketPath, std::string(output.waitingBytes()));
+}
+
 class KYTReporting::Implementation {
  public:
-  explicit Implementation(std::shared_ptr<client::Session> made) : session(std::move(made)) {}
-  std::shared_ptr<client::Session> session;
+  Implementation(std::shared_ptr<client::Session> made, std::chrono::milliseconds finishing)
+      : session(std::move(made)), finishOnDestruction(finishing) {}
+  const std::shared_ptr<client::Session> session;
+  const std::chrono::milliseconds finishOnDestruction;
 };
 
 KYTReporting::KYTReporting(std::shared_ptr<Implementation> implementation)
     : implementation_(std::move(implementation)) {}
 
 std::unique_ptr<KYTReporting> KYTReporting::open(Options options) {
-  auto session = makeSession(std::move(options), false);
+  return open(std::move(options), Behaviour());
+}
+
+std::unique_ptr<KYTReporting> KYTReporting::open(Options options, const Behaviour& behaviour) {
+  auto session = makeSession(std::move(options), false, behaviour);
   client::Loop::current()->add(session);
   return std::unique_ptr<KYTReporting>(
-      new KYTReporting(std::make_shared<Implementation>(std::move(session))));
+      new KYTReporting(std::make_shared<Implementation>(std::move(session), behaviour.finishOnDestruction)));
 }
 
 KYTReporting::~KYTReporting() {
+  if (implementation_->finishOnDestruction.count() > 0) finish(implementation_->finishOnDestruction);
   implementation_->session->close();
 }
 

@@ -33,6 +33,8 @@ class Output {
   // To a call of the daemon of which there is no such method.
   void refuse(uint32_t replySerial);
 
+  // All that waits, since restart().
+  [[nodiscard]] std::string_view waitingBytes() const { return std::string_view(bytes_).substr(at_); }
   [[nodiscard]] size_t waiting() const { return bytes_.size() - at_; }
 
   struct Written {

@@ -31,11 +31,14 @@ std::string secondsText(milliseconds time) {
 
 }  // namespace
 
-Session::Session(KYTReporting::Options options, Loop* loop, bool single)
+Session::Session(KYTReporting::Options options, Loop* loop, bool single,
+                 const KYTReporting::Behaviour& behaviour)
     : problem_(problemOf(options.sessionInfo)),
       single_(single),
       callDeadline_(std::min(options.callDeadline, kLongestWait)),
       finishWaitsForDaemon_(options.finishWaitsForDaemon),
+      waitForDaemon_(behaviour.waitForDaemon),
+      flushInterval_(std::min(behaviour.flushInterval, kLongestWait)),
       loop_(loop),
       queue_(options.maxQueuedMessages, options.maxQueuedBytes),
       standing_(nameOf(options.sessionInfo, single), std::move(options.onStateChange)),

@@ -34,7 +34,7 @@ class Loop;
 
 class Session {
  public:
-  Session(KYTReporting::Options options, Loop* loop, bool single);
+  Session(KYTReporting::Options options, Loop* loop, bool single, const KYTReporting::Behaviour& behaviour);
   ~Session();
   Session(const Session&) = delete;
   Session& operator=(const Session&) = delete;
@@ -101,6 +101,8 @@ class Session {
   void drainCommand(std::unique_ptr<Command> command) REQUIRES(libraryThread);
   bool write(SteadyTime now) REQUIRES(libraryThread);
   void pingIfDue(SteadyTime now) REQUIRES(libraryThread);
+  void wrote() REQUIRES(libraryThread);
+  void flushIfDue(SteadyTime now) REQUIRES(libraryThread);
   void greet() REQUIRES(libraryThread);
   [[nodiscard]] const char* readMessages() REQUIRES(libraryThread);
   void handle(const Message& message) REQUIRES(libraryThread);
@@ -116,14 +118,16 @@ class Session {
   const std::string problem_;  // of the session's information: nothing is sent
   const bool single_;
   const std::chrono::milliseconds callDeadline_;
-  const bool finishWaitsForDaemon_;
+  const bool finishWaitsForDaemon_, waitForDaemon_;
+  const std::chrono::milliseconds flushInterval_;  // 0: never by itself
   Loop* const loop_;
 
   // Any thread.
   OutgoingQueue queue_;
   Figures figures_;
   std::atomic<bool> closed_{false}, inert_{false}, connected_{false}, saidGoodbye_{false};
-  std::atomic<bool> unserved_{false};  // there was no thread for it
+  std::atomic<bool> unserved_{
+      false};  // there was no thread for it, or no daemon, and it does not wait for one
   Standing standing_;
   Waiters waiters_;
 
@@ -137,6 +141,7 @@ class Session {
   bool ending_ GUARDED_BY(libraryThread) = false;          // the goodbye is said: nothing goes after it
   bool triedAtGoodbye_ GUARDED_BY(libraryThread) = false;  // the last attempt before giving up
   bool done_ GUARDED_BY(libraryThread) = false;
+  SteadyTime nextFlush_ GUARDED_BY(libraryThread) = SteadyTime::max();  // of what was written since the last
 };
 
 }  // namespace kyt::client

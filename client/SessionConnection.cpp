@@ -26,7 +26,10 @@ bool Session::hasWork() const {
 }
 
 std::optional<SteadyTime> Session::nextDeadline() const {
-  if (connection_.isTaken()) return unanswered_.nextPing();
+  if (connection_.isTaken()) {
+    const SteadyTime due = std::min(unanswered_.nextPing().value_or(SteadyTime::max()), nextFlush_);
+    return due == SteadyTime::max() ? std::nullopt : std::optional(due);
+  }
   const SteadyTime next = connection_.isOpen() ? queue_.nextDeadline()
                                                : std::min(queue_.nextDeadline(), connection_.nextAttempt());
   if (next == SteadyTime::max()) return std::nullopt;
@@ -53,20 +56,24 @@ bool Session::ensureConnected(SteadyTime now) {
   if (connection_.isOpen()) return true;
   if (saidGoodbye_ && !std::exchange(triedAtGoodbye_, true)) connection_.setNextAttempt(now);
   if (now >= connection_.nextAttempt()) connect(now);
-  if (!done_ && givesUp()) end(ClientError::notConnected, standing_.why());
+  if (!done_ && givesUp()) {
+    unserved_ = !waitForDaemon_;
+    end(ClientError::notConnected, standing_.why());
+  }
   return !done_ && connection_.isOpen();
 }
 
 // Nothing was ever taken, and nobody is there to take anything: a program that ends need not wait.
 bool Session::givesUp() const {
-  return saidGoodbye_ && triedAtGoodbye_ && connection_.foundNobody() && !connection_.wasEverTaken() &&
-         !finishWaitsForDaemon_ && !connection_.isOpen();
+  if (!connection_.foundNobody() || connection_.wasEverTaken() || connection_.isOpen()) return false;
+  return !waitForDaemon_ || (saidGoodbye_ && triedAtGoodbye_ && !finishWaitsForDaemon_);
 }
 
 bool Session::move(SteadyTime now) {
   bool moved = false;
   for (;;) {
     const bool drained = connection_.isTaken() && !ending_ && drain();
+    if (connection_.isTaken()) flushIfDue(now);
     if (connection_.isTaken()) pingIfDue(now);
     const bool written = wantsToWrite() && write(now);
     moved |= drained || written;
@@ -93,6 +100,7 @@ void Session::disconnected(SteadyTime now, std::string reason) {
   standing_.become(ended.refused ? State::refused : State::noDaemon, reason);
   connected_ = false;
   queue_.lookAgain();  // deadlines count again
+  nextFlush_ = SteadyTime::max();
   output_.restart();
   Unanswered::Left left = unanswered_.takeAll();
   figures_.lostOnConnectionEnd.add(left.messages);
@@ -123,6 +131,7 @@ void Session::drainMessage(const MessageArguments& message) {
     return;
   }
   figures_.written.add();
+  wrote();
   if (!kept_.isConfigured() && figures_.sentUnconfigured.add() == 0)
     standing_.become(State::connected,
                      "messages are sent, and startConfiguration was not called: the daemon drops them");
@@ -139,7 +148,11 @@ void Session::drainCommand(std::unique_ptr<Command> command) {
     call.answer.fail(ClientError::invalid, "the arguments cannot be sent: too large, or nested too deeply");
     return;
   }
-  if (command->isMessage()) figures_.written.add();
+  if (command->isMessage()) {
+    figures_.written.add();
+    wrote();
+  }
+  if (call.method == Method::flushMessagesWithCompletion) nextFlush_ = SteadyTime::max();
   kept_.takeOver(call);
   if (call.method == Method::startConfigWithCompletionHandler && standing_.state() == State::connected)
     standing_.note(State::connected, reasonOfConnected(true));
@@ -153,6 +166,20 @@ bool Session::write(SteadyTime now) {
     if (!done_ && connection_.isOpen()) disconnected(now, "the connection ended");
   }
   return written.any;
+}
+
+// A message: what is batched leaves an interval after the first of it, at the latest.
+void Session::wrote() {
+  if (flushInterval_.count() > 0 && nextFlush_ == SteadyTime::max())
+    nextFlush_ = std::chrono::steady_clock::now() + flushInterval_;
+}
+
+void Session::flushIfDue(SteadyTime now) {
+  if (now < nextFlush_ || ending_) return;
+  nextFlush_ = SteadyTime::max();
+  Call call{Method::flushMessagesWithCompletion};
+  if (const std::optional<uint32_t> serial = output_.call(call, false))
+    unanswered_.addCall(*serial, std::make_unique<Command>(std::move(call)));
 }
 
 void Session::pingIfDue(SteadyTime now) {

@@ -8,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "client/LastWord.h"
 #include "kytreporting/KYTReporting.h"
 
 struct kyt_dictionary {
@@ -16,6 +17,10 @@ struct kyt_dictionary {
 
 struct kyt_array {
   kyt::Array value;
+};
+
+struct kyt_last_word {
+  kyt::linux_client::LastSocket socket;
 };
 
 struct kyt_session {
@@ -58,11 +63,17 @@ kyt_statistics inC(const KYTReporting::Statistics& figures) {
           figures.droppedTooLate};
 }
 
-KYTReporting::Options optionsOf(const kyt_options& given) {
+// What the caller's library knew; the rest is 0.
+kyt_options knownOf(const kyt_options& given) {
   kyt_options known{};
   // Whole fields alone: half a pointer points nowhere.
   const size_t size = given.size / alignof(kyt_options) * alignof(kyt_options);
   std::memcpy(&known, &given, std::min(size, sizeof known));
+  return known;
+}
+
+KYTReporting::Options optionsOf(const kyt_options& given) {
+  const kyt_options known = knownOf(given);
   KYTReporting::Options options;
   if (known.socket_path != nullptr) options.socketPath = known.socket_path;
   if (known.session_info != nullptr) options.sessionInfo = known.session_info->value;
@@ -110,6 +121,15 @@ class CallbackError {
  private:
   const kyt_error before_;  // of the callback in which this one runs
 };
+
+KYTReporting::Behaviour behaviourOf(const kyt_options& given) {
+  const kyt_options known = knownOf(given);
+  KYTReporting::Behaviour behaviour;
+  behaviour.flushInterval = std::chrono::milliseconds(known.flush_interval_milliseconds);
+  behaviour.finishOnDestruction = std::chrono::milliseconds(known.finish_on_close_milliseconds);
+  behaviour.waitForDaemon = known.ends_without_daemon == 0;
+  return behaviour;
+}
 
 KYTReporting::StatesCompletion statesCompletion(kyt_states_callback callback, void* context) {
   if (callback == nullptr) return nullptr;
@@ -276,7 +296,7 @@ int kyt_session_info_check(const kyt_dictionary* session_info, char* error, size
 }
 kyt_session* kyt_session_open(const kyt_options* options) {
   if (options == nullptr || options->size == 0) return nullptr;
-  return new kyt_session{KYTReporting::open(optionsOf(*options))};
+  return new kyt_session{KYTReporting::open(optionsOf(*options), behaviourOf(*options))};
 }
 void kyt_session_close(kyt_session* session) {
   delete session;
@@ -391,6 +411,18 @@ void kyt_send_single_message(const kyt_options* options, uint32_t category, uint
                                     callback(error ? nullptr : text.c_str(),
                                              error ? error->localizedDescription.c_str() : nullptr, context);
                                   });
+}
+kyt_last_word* kyt_last_word_new(const kyt_options* options, uint32_t category, uint32_t type,
+                                 const kyt_dictionary* payload) {
+  if (options == nullptr || options->size == 0) return nullptr;
+  auto socket = kyt::client::lastWord(optionsOf(*options), category, type, optional(payload));
+  return socket ? new (std::nothrow) kyt_last_word{*std::move(socket)} : nullptr;
+}
+void kyt_last_word_free(kyt_last_word* word) {
+  delete word;
+}
+int kyt_last_word_send(const kyt_last_word* word, unsigned timeout_milliseconds) {
+  return word != nullptr && word->socket.send(timeout_milliseconds) ? 1 : 0;
 }
 
 }  // extern "C"

@@ -28,6 +28,9 @@ class Options(ctypes.Structure):
         ("state_context", c_void_p),
         ("call_deadline_milliseconds", c_int64),
         ("finish_waits_for_daemon", c_int),
+        ("flush_interval_milliseconds", c_int64),
+        ("finish_on_close_milliseconds", c_int64),
+        ("ends_without_daemon", c_int),
     ]
 
 

@@ -123,6 +123,8 @@ class Session:
     on_state_change: called as (State, reason) on the library's thread; it must not wait for answers.
     call_deadline: seconds that an answer waits for a daemon that is not there; 0: as long as the session lives.
     finish_waits_for_daemon: whether finish() waits for a daemon that was never there.
+    flush_interval: seconds that an event is batched at most; 0: until something else flushes.
+    wait_for_daemon: False ends a session that finds no daemon when it first tries to connect.
     configure: asks to be configured at once. Without, nothing arrives before configure() was called.
 
     Raises InvalidError for information that cannot be meant so. Opening never waits: a daemon that is not there yet is
@@ -147,6 +149,8 @@ class Session:
         on_state_change: Optional[Callable[[State, str], object]] = None,
         call_deadline: float = 30.0,
         finish_waits_for_daemon: bool = False,
+        flush_interval: float = 0.0,
+        wait_for_daemon: bool = True,
         configure: bool = True,
     ) -> None:
         self._information: Dict[str, Any] = {
@@ -165,6 +169,8 @@ class Session:
         self._told = on_state_change
         self._deadline = call_deadline
         self._waits = finish_waits_for_daemon
+        self._flush_interval = flush_interval
+        self._needs_daemon = not wait_for_daemon
         self._configured = configure
         self._shared: Dict[str, Any] = {}
         self._digest: Optional[Tuple[bytes, int]] = None
@@ -198,6 +204,8 @@ class Session:
         options.max_queued_messages, options.max_queued_bytes = self._bounds
         options.call_deadline_milliseconds = int(self._deadline * 1000) or -1
         options.finish_waits_for_daemon = self._waits
+        options.flush_interval_milliseconds = int(self._flush_interval * 1000)
+        options.ends_without_daemon = self._needs_daemon
         if self._told is not None:
             options.on_state_change = _on_state_change
             options.state_context = self._number

@@ -181,3 +181,27 @@ def test_totals_are_those_of_all_sessions(kyt_listener):
             session.send(1, 1)
     assert kyt.total_statistics().accepted == before + 3
     assert closes(kyt.total_statistics())
+
+
+def test_an_interval_flushes_what_was_sent(kyt_listener):
+    with kyt.Session(20, flush_interval=0.01) as session:
+        session.send(1, 1)
+        kyt_listener.wait_for("flush")
+        session.send(1, 2)
+        kyt_listener.wait_for("flush", 2)
+    kyt_listener.wait_for("end")
+    assert [event["event"] for event in kyt_listener.events()].count("flush") == 2
+
+
+def test_a_session_that_does_not_wait_for_a_daemon_ends_without_one(tmp_path):
+    session = kyt.Session(20, socket=str(tmp_path / "none"), wait_for_daemon=False)
+
+    def refused():
+        try:
+            return not session.send(1, 1)
+        except kyt.NotConnectedError as error:
+            return str(tmp_path / "none") in str(error)
+
+    assert eventually(refused)
+    figures = session.statistics()
+    assert closes(figures) and figures.queued == 0

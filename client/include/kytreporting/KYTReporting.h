@@ -171,10 +171,25 @@ class KYT_EXPORT KYTReporting {
   // absent, so a session with one sends nothing: sendMessage() returns false, and completions get this error.
   [[nodiscard]] static std::optional<Error> checkSessionInfo(const Dictionary& sessionInfo);
 
+  // What a session does by itself; given beside the options, which programs in the field have compiled in.
+  struct Behaviour {
+    // Every so often, if anything was sent since the last flush, the session flushes: the longest that an event is batched.
+    // 0: never.
+    std::chrono::milliseconds flushInterval{0};
+    // The destructor calls finish() with this time. 0: it closes without waiting.
+    std::chrono::milliseconds finishOnDestruction{0};
+    // If not, a session that finds nobody, or is refused, when it first tries to connect has ended: its messages are lost
+    // and counted, completions get the code notConnected, sendMessage() returns false. One that a daemon has taken waits
+    // for the next as any other.
+    bool waitForDaemon = true;
+  };
+
   // Never blocks and never fails: a daemon that does not run yet is waited for. Where the system gives the library no
   // thread, the session has ended when this returns: completions get the code notConnected, stateReason() says so.
   [[nodiscard]] static std::unique_ptr<KYTReporting> open(Options options);
-  // Closes without waiting: what was queued and not written is counted as lost. finish() first to keep it.
+  [[nodiscard]] static std::unique_ptr<KYTReporting> open(Options options, const Behaviour& behaviour);
+  // Closes without waiting: what was queued and not written is counted as lost. finish() first to keep it, or let
+  // Behaviour::finishOnDestruction do so.
   ~KYTReporting();
   KYTReporting(const KYTReporting&) = delete;
   KYTReporting& operator=(const KYTReporting&) = delete;

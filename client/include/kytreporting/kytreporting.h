@@ -128,6 +128,13 @@ typedef struct kyt_options {
    * lives. */
   int64_t call_deadline_milliseconds;
   int finish_waits_for_daemon; /* 0: kyt_session_finish gives up when no daemon ever took anything and none is there */
+  /* Flushes every so often if anything was sent since the last flush. 0: never. */
+  int64_t flush_interval_milliseconds;
+  /* kyt_session_close first does what kyt_session_finish does, for so long at most. 0: it does not. */
+  int64_t finish_on_close_milliseconds;
+  /* Not 0: a session that finds nobody when it first tries to connect has ended; it takes nothing, and what was queued is
+   * lost and counted. */
+  int ends_without_daemon;
 } kyt_options;
 
 /* Whether a session's information can be meant so: 0 when it has a key that there is not, or a value of another
@@ -221,6 +228,18 @@ KYT_API void kyt_total_statistics(kyt_statistics* statistics);
 KYT_API void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                                      const kyt_dictionary* payload, kyt_text_callback callback,
                                      void* context);
+
+/* A program's last word: one event, encoded when the program is well, and sent by a handler of SIGSEGV, SIGABRT and the
+ * like. Of the options the socket, session information and user information count. Null for missing options, wrong session
+ * information, numbers out of range, a socket's path that is too long, and more than a megabyte. Made once, it can be sent
+ * any number of times, by one thread at a time. */
+typedef struct kyt_last_word kyt_last_word;
+KYT_API kyt_last_word* kyt_last_word_new(const kyt_options* options, uint32_t category, uint32_t type,
+                                         const kyt_dictionary* payload);
+KYT_API void kyt_last_word_free(kyt_last_word* word);
+/* Async-signal-safe: on a connection of its own, with no memory taken, no lock and no part of the library but this. Whether
+ * the daemon answered that it has taken the event, within so many milliseconds. Leaves errno as it was. */
+KYT_API int kyt_last_word_send(const kyt_last_word* word, unsigned timeout_milliseconds);
 
 #ifdef __cplusplus
 }
