@@ -1,5 +1,7 @@
 #include "tools/demo/DemoBag.h"
 
+#include "platform/objects/Keys.h"
+
 namespace kyt::tools {
 
 namespace {
@@ -51,6 +53,16 @@ Dictionary demoBag(const std::string& serverBase, const std::string& backend, co
       {backend, Dictionary{{"display_url", serverBase + "/"},
                            {"clients", Array{client(clientName, serverBase), guest(serverBase)}}}}};
   return {{"version", "demo-1"}, {"refresh_cycle", 3600}, {"release", section}, {"vantu_internal", section}};
+}
+
+Dictionary openBag(const std::string& serverBase) {
+  const Dictionary anyone = {{"filters", Array{}},
+                             {"locale_whitelist", Array{"DE", "FR"}},
+                             {"sampling_threshold", 1.0},
+                             {"event_threshold", 49},
+                             {"post_url", serverBase + "/events/stage"}};
+  const Dictionary section = {{kKYTReportingBackendHTTPPost, Dictionary{{"clients", Array{anyone}}}}};
+  return {{"version", "stage-1"}, {"release", section}, {"vantu_internal", section}};
 }
 
 std::vector<DemoClient> demoClients() {

@@ -20,6 +20,13 @@ inline constexpr char kDemoAccount[] = "owner@example.org";
 [[nodiscard]] Dictionary demoBag(const std::string& serverBase, const std::string& backend,
                                  const std::string& clientName);
 
+// The names of all storebags that client types have.
+inline constexpr const char* kStorebagNames[] = {"brisca", "cadmor", "dulvek", "emrit",  "fosska",
+                                                 "gelmar", "hovit",  "ismel",  "jorvan", "kelvit",
+                                                 "lurra",  "morvek", "nessim", "torvel"};
+// A storebag that lets all of any client leave by "httppost", from any country.
+[[nodiscard]] Dictionary openBag(const std::string& serverBase);
+
 // Those that the bags are for.
 struct DemoClient {
   std::string name;

@@ -14,6 +14,7 @@
 #include "tools/StorebagFile.h"
 #include "tools/demo/Checks.h"
 #include "tools/demo/DemoBag.h"
+#include "tools/demo/ProgramRun.h"
 #include "tools/demo/Stage.h"
 #include "tools/demo/Trickle.h"
 
@@ -155,7 +156,8 @@ int main(int argc, char** argv) {
   options.programs = executableFolder();
   options.share = options.programs + "/../share";
   std::string daemonUser = "daemon", clientUser = "nobody";
-  bool once = false;
+  bool once = false, staged = false;
+  std::vector<std::string> program;
   commandLine.option("--programs", options.programs, "Folder of the programs, instead of this one's own");
   commandLine.option(
       "--share", options.share,
@@ -165,8 +167,15 @@ int main(int argc, char** argv) {
   commandLine.option("--daemon-user", daemonUser, "Started by root: whom the daemon runs as").showsDefault();
   commandLine.option("--client-user", clientUser, "Started by root: whom its clients run as").showsDefault();
   commandLine.flag("--once", once, "End after the checks; status 0 only if every event arrived as it should");
+  commandLine.flag("--stage", staged,
+                   "Run a program instead, and print what became of what it reported: --stage -- PROGRAM …");
+  commandLine.option("program", program, "With --stage: the program and its arguments, behind --");
   if (const auto status = commandLine.parse(argc, argv)) return *status;
-  if (geteuid() == 0) {
+  if (staged == program.empty()) {
+    complain("--stage and a program go together: kytdemo --stage -- PROGRAM …");
+    return kWrongUsage;
+  }
+  if (geteuid() == 0 && !staged) {
     options.daemonUser = User::of(daemonUser);
     options.clientUser = User::of(clientUser);
     if (!options.daemonUser) return complain("there is no user " + daemonUser);
@@ -174,6 +183,11 @@ int main(int argc, char** argv) {
   }
   options.keepFolder = !options.folder.empty();
   options.serverArguments = {"--digest-key", std::string("kytdemo=") + kDemoDigestKeyHex};
+  if (staged) {
+    auto stage = Stage::make(std::move(options));
+    if (auto* error = std::get_if<Error>(&stage)) return complain(error->localizedDescription);
+    return runProgramOn(*std::get<std::unique_ptr<Stage>>(stage), program);
+  }
   // Children inherit a clean mask; this process takes the two signals when it waits for them.
   if (!once) {
     sigset_t set;

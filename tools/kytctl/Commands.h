@@ -22,10 +22,12 @@ struct SendOptions {
   int clientType = 0;
   uint32_t sessionID = 1;
   uint16_t clientVersion = 1;
-  uint16_t category = 0, type = 0;
+  std::optional<uint16_t> category, type;
   std::string payloadJSON = "{}";
   std::string userInfoJSON;  // empty: none
   bool requireUserInfo = false;
+  bool fromStandardInput = false;  // many events, of one session
+  bool quietIfNoDaemon = false;
 };
 
 struct ListenOptions {

@@ -41,7 +41,8 @@ struct Arguments {
 constexpr char kFinished[] =
     R"("finished" means that the daemon had a storebag for the client type and has offered the event to its back ends.
 It does not mean that the event was sent: no consent, another country, a list, sampling or a server may have stopped
-it. The daemon's log and the server tell.)";
+it. The daemon's log and the server tell.
+With --stdin a line is {"category":10,"type":1,"payload":{…},"flag":0}; the live back ends and the figures are printed.)";
 
 constexpr char kSessionSteps[] =
     R"(Steps, by "do"; from standard input each runs as soon as its line is there. A key that a step does not have is an error:
@@ -94,12 +95,15 @@ void addSend(const Command& program, Arguments& a) {
   send.option("--client-type", a.send.clientType, "The client type, 0 to 23").required().between(0, 23);
   send.option("--session-id", a.send.sessionID, "The session ID, 32 bits");
   send.option("--client-version", a.send.clientVersion, "The client version, 16 bits");
-  send.option("--category", a.send.category, "The event's category (method)").required();
-  send.option("--type", a.send.type, "The event's type (response code)").required();
+  send.option("--category", a.send.category, "The event's category (method)");
+  send.option("--type", a.send.type, "The event's type (response code)");
   send.option("--payload", a.send.payloadJSON, "A JSON object");
   send.option("--user-info", a.send.userInfoJSON,
               "A JSON object; ClientName and ServiceName choose the client entry");
   send.flag("--require-user-info", a.send.requireUserInfo, "The session promises user information");
+  send.flag("--stdin", a.send.fromStandardInput,
+            "Send the events of standard input, a JSON object a line, in one session");
+  send.flag("--quiet-if-no-daemon", a.send.quietIfNoDaemon, "Succeed without a word where no daemon listens");
   send.ends(kFinished);
   send.runs([&a] { a.status = sendCommand(a.connection, a.send); });
 

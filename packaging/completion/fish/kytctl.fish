@@ -129,6 +129,8 @@ complete -c kytctl -n '__kytctl_at -b explain' -l draw -x -d 'The sampling draw,
 complete -c kytctl -n '__kytctl_at -b explain' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at -b send' -l category -x -d 'The category of the event'
 complete -c kytctl -n '__kytctl_at -b send' -l type -x -d 'The type of the event'
+complete -c kytctl -n '__kytctl_at -b send' -l stdin -d 'Events of standard input'
+complete -c kytctl -n '__kytctl_at -b send' -l quiet-if-no-daemon -d 'Succeed where no daemon listens'
 complete -c kytctl -n '__kytctl_at -b send' -l payload -x -d 'A JSON object'
 complete -c kytctl -n '__kytctl_at session' -F
 complete -c kytctl -n '__kytctl_at owner export' -F
