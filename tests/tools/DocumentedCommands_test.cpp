@@ -6,6 +6,7 @@
 
 #include "tests/integration/StageFixture.h"
 #include "tests/support/Eventually.h"
+#include "tests/support/Sanitizers.h"
 #include "tests/tools/ManualText.h"
 #include "tools/demo/Http.h"
 
@@ -66,6 +67,85 @@ TEST_F(TryingIt, TheCommandsDeliver) {
   EXPECT_TRUE(run.text.starts_with("finished\nlive: ")) << run.text;
   EXPECT_TRUE(arrive("client=example&service=demo&method=1&status=2", 1)) << run.text;
   EXPECT_TRUE(arrive("client=example&service=demo&method=10&status=1", 1)) << run.text;
+}
+
+TEST(TestingAProgram, TheCommandsShowWhatItTold) {
+  const TemporaryFolder folder;
+  folder.write("script.jsonl", blockOf("PROGRAMS.md", "jsonl example=script"));
+  const ProgramRun run = shell(folder.path(), blockOf("PROGRAMS.md", "sh example=listen"));
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find(
+                R"({"event":"message","connection":1,"category":10,"type":1,"flag":0,"payload":{"step":1}})"),
+            std::string::npos)
+      << run.text;
+}
+
+TEST(DemonstrationAroundAProgram, TellsWhatArrivedAndWhatWasDroppedAndWhy) {
+  const TemporaryFolder folder;
+  folder.write("lines", R"({"category":10,"type":1,"payload":{"a":1}})"
+                        "\n"
+                        R"({"category":11,"type":2,"flag":1})"
+                        "\n");
+  const auto staged = [&folder](const std::string& program) {
+    return shell(folder.path(), "kytdemo --share " KYT_SHARE " --stage -- " + program);
+  };
+  const ProgramRun sent = staged("sh -c 'kytctl send --client-type 8 --stdin < lines; exit 7'");
+  EXPECT_EQ(sent.status, 7) << sent.text;
+  EXPECT_NE(sent.text.find("live: httppost\nsent 2, lost 0, dropped 0\n"), std::string::npos) << sent.text;
+  EXPECT_NE(sent.text.find("1 × client , sender QJ, method 10, status 1\n"), std::string::npos) << sent.text;
+  EXPECT_NE(sent.text.find("1 × client , sender QJ, method 11, status 2\n"), std::string::npos) << sent.text;
+  EXPECT_TRUE(std::regex_search(sent.text, std::regex("httppost +2 +0 +2 +0\n"))) << sent.text;
+  const ProgramRun dropped = staged("kytctl send --client-type 2 --category 10 --type 1");
+  EXPECT_EQ(dropped.status, 1) << dropped.text;
+  EXPECT_NE(dropped.text.find("storebag not available\n"), std::string::npos) << dropped.text;
+  EXPECT_NE(dropped.text.find("no-storebag"), std::string::npos) << dropped.text;
+  EXPECT_EQ(staged("").status, 2);
+}
+
+TEST(SendFromStandardInput, EndsAtALineThatIsWrongAfterWhatStoodBefore) {
+  const TemporaryFolder folder;
+  const ProgramRun run = shell(folder.path(), R"(kytctl listen --socket "$PWD/s" > told & daemon=$!
+until [ -S s ]; do sleep 0.01; done
+printf '{"category":1,"type":2}\n\n{"category":"x","type":2}\n' |
+  kytctl send --socket "$PWD/s" --client-type 20 --stdin || echo "status $?"
+kill $daemon; wait $daemon; grep -c '"event":"message"' told
+)");
+  EXPECT_NE(run.text.find("kytctl: line 3\n"), std::string::npos) << run.text;
+  EXPECT_NE(run.text.find("status 1\n"), std::string::npos) << run.text;
+  EXPECT_TRUE(run.text.ends_with("1\n")) << run.text;
+}
+
+TEST(SendWithoutADaemon, IsQuietWhereItIsToBe) {
+  const TemporaryFolder folder;
+  const std::string line = "kytctl send --socket \"$PWD/none\" --client-type 20 --category 1 --type 1";
+  EXPECT_EQ(shell(folder.path(), line).status, 1);
+  const ProgramRun quiet = shell(folder.path(), line + " --quiet-if-no-daemon");
+  EXPECT_EQ(quiet.status, 0);
+  EXPECT_EQ(quiet.text, "");
+}
+
+class PythonOnAStage : public StageTest {
+ protected:
+  void SetUp() override {
+    if (kSanitized) GTEST_SKIP() << "the interpreter is built without the sanitizer";
+    lay();
+    putBag("cadmor", {entry("example")});
+    startDaemon();
+  }
+  [[nodiscard]] ProgramRun run(const std::string& text) const {
+    return runProgram("env", {"PYTHONPATH=" KYT_SOURCE_DIR "/bindings/python", "PYTHONDONTWRITEBYTECODE=1",
+                              "LD_LIBRARY_PATH=" KYT_LIBRARIES, "KYTREPORTING_SOCKET=" + socket(),
+                              "/usr/bin/python3", "-c", text});
+  }
+};
+
+TEST_F(PythonOnAStage, ProgramsOfTheGuideAndTheManualReport) {
+  const ProgramRun guide = run(blockOf("PROGRAMS.md", "python example=python"));
+  EXPECT_EQ(guide.status, 0) << guide.text;
+  const ProgramRun manual = run(exampleOf("kytpython.3", "python"));
+  EXPECT_EQ(manual.status, 0) << manual.text;
+  EXPECT_TRUE(arrive("client=example&service=demo&method=10&status=1", 2)) << daemonLog();
+  EXPECT_TRUE(arrive("client=example&service=demo&method=10&status=2", 1)) << daemonLog();
 }
 
 class IPCFromAShell : public StageTest {
