@@ -84,7 +84,7 @@ uint32_t lineWithControlCharacter(std::string_view text) {
   for (char c : text) {
     if (c == '\n') {
       ++line;
-    } else if ((c >= 0 && c < 0x20 && c != '\t' && c != '\r') || c == 0x7F) {
+    } else if ((static_cast<unsigned char>(c) < 0x20 && c != '\t' && c != '\r') || c == 0x7F) {
       return line;
     }
   }
