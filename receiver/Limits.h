@@ -14,8 +14,6 @@ struct Limits {
   // Connections of the posts' port: descriptors. Further ones wait to be accepted.
   static constexpr unsigned maxConnections = 8192;
   static constexpr unsigned maxMetricsConnections = 16;
-  // For the body of a post to be whole: a slow device holds a connection no longer.
-  static constexpr std::chrono::seconds bodyTime{60};
   // A connection without a request's headers. Longer than proxies keep their connections to us (nginx: 60 s), so that
   // it is them who end an idle one, and never with a post on its way.
   static constexpr std::chrono::seconds idleTime{75};
@@ -42,9 +40,13 @@ struct Limits {
   static constexpr std::chrono::milliseconds retryPause{1000};
   // Bytes of a header that a message carries on; what is longer is cut.
   static constexpr size_t maxFactBytes = 256;
-  // A post's JSON, where it is looked at: bytes after decompression (a bomb ends there), and nesting.
+  // Where posts are opened: bytes after decompression, which are so many times those before, but so many at least and at
+  // most. The daemon's compress four to fifty to one; of a bomb a fraction of a second's work is done.
+  static constexpr uint64_t maxInflation = 200;
+  static constexpr uint64_t leastInflatedBytes = uint64_t{1} << 20;
   static constexpr uint64_t maxInflatedBytes = uint64_t{128} << 20;
   static constexpr unsigned maxJSONDepth = 32;
+  static constexpr unsigned checkThreads = 2;
   // Servers, paths and keys that a configuration may name: more is a mistake.
   static constexpr size_t maxPartitions = 1024;
 };

@@ -30,6 +30,10 @@ bool isIdentity(std::string_view encoding) {
 
 }  // namespace
 
+bool isGzip(const Request& request) {
+  return !isIdentity(headerOf(request, "Content-Encoding"));
+}
+
 const PathSettings* PostCheck::pathOf(std::string_view urlPath) const {
   const auto found = std::find_if(settings_.paths.begin(), settings_.paths.end(),
                                   [&](const PathSettings& path) { return path.urlPath == urlPath; });
@@ -53,7 +57,7 @@ std::optional<Rejection> PostCheck::rejection(const Request& request, bool& hasD
   const std::string_view body = request.body;
   if (body.empty()) return Rejection{Refusal::empty, 400, "the post is empty"};
   // The magic of gzip with its only method.
-  if (!isIdentity(headerOf(request, "Content-Encoding")) && !body.starts_with("\x1f\x8b\x08"))
+  if (isGzip(request) && !body.starts_with("\x1f\x8b\x08"))
     return Rejection{Refusal::notGzip, 400, "the body is no gzip"};
   const PathSettings* path = pathOf(request.path);
   return path == nullptr ? std::nullopt : rejectionOfDigest(*path, request, hasDigest);
@@ -99,7 +103,7 @@ std::vector<std::pair<std::string, std::string>> factsOf(const Request& request,
   add("Kyt-Client", "X-KYT-Client-Name");
   add("Kyt-Service", "X-KYT-Service-Name");
   add("Kyt-Client-Version", "X-KYT-Client-Version");
-  facts.emplace_back("Kyt-Encoding", isIdentity(headerOf(request, "Content-Encoding")) ? "identity" : "gzip");
+  facts.emplace_back("Kyt-Encoding", isGzip(request) ? "gzip" : "identity");
   facts.emplace_back("Kyt-Digest", hasDigest ? "valid" : "absent");
   return facts;
 }

@@ -43,6 +43,8 @@ class PostCheck {
                                                                        const std::string& id,
                                                                        int64_t receivedMilliseconds,
                                                                        bool hasDigest);
+// What its header says of its body's encoding.
+[[nodiscard]] bool isGzip(const http::Request& request);
 // SHA-256 in hexadecimal digits.
 [[nodiscard]] std::string messageID(std::string_view body);
 

@@ -3,12 +3,14 @@
 #include <algorithm>
 #include <utility>
 
+#include "receiver/JSONCheck.h"
 #include "receiver/Limits.h"
 
 namespace kyt::receiver {
 namespace {
 
 using http::Answer;
+using http::LaterReply;
 using http::Reply;
 using http::Request;
 using http::textReply;
@@ -39,7 +41,9 @@ PostHandler::PostHandler(const Settings& settings, Options options, Delivery& de
       deadLetters_(deadLetters),
       clock_(clock),
       figures_(figures),
-      check_(settings) {}
+      check_(settings) {
+  if (options.opensPosts) checks_.emplace(Limits::checkThreads);
+}
 
 Reply PostHandler::refuse(Refusal refusal, const char* text) const {
   figures_.refuse(refusal);
@@ -86,22 +90,38 @@ Reply PostHandler::replyFor(Fate fate, uint64_t bytes, bool hasDigest) const {
   return {};
 }
 
-Answer PostHandler::answer(Request& request) {
-  bool hasDigest = false;
-  if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
-  if (isClosed_) return refuse(Refusal::stopping, "this receiver is about to end");
+void PostHandler::deliver(Request& request, bool hasDigest, const std::shared_ptr<LaterReply>& later) {
   const TimeValue now = clock_.timeOfDay();
   auto message = std::make_shared<LogMessage>();
   message->id = messageID(request.body);
   message->headers = factsOf(request, message->id, now.seconds * 1000 + now.microseconds / 1000, hasDigest);
   message->body = std::move(request.body);
-  auto later = std::make_shared<http::LaterReply>();
   const uint64_t bytes = message->body.size();
-  ++waiting_;
   delivery_.take(std::move(message), [this, later, bytes, hasDigest](Fate fate) {
     later->give(replyFor(fate, bytes, hasDigest));
     --waiting_;
   });
+}
+
+void PostHandler::open(Request& request, bool hasDigest, const std::shared_ptr<LaterReply>& later) {
+  const auto problem = problemOfPost(request.body, isGzip(request));
+  if (!problem) return deliver(request, hasDigest, later);
+  const Refusal refusal = problem->isGzip ? Refusal::notGzip : Refusal::notJSON;
+  later->give(reject(request, {refusal, 400, problem->text}));
+  --waiting_;
+}
+
+Answer PostHandler::answer(Request& request) {
+  bool hasDigest = false;
+  if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
+  if (isClosed_) return refuse(Refusal::stopping, "this receiver is about to end");
+  auto later = std::make_shared<LaterReply>();
+  ++waiting_;
+  // The request stays until the reply is given.
+  if (checks_)
+    checks_->submit([this, &request, hasDigest, later] { open(request, hasDigest, later); });
+  else
+    deliver(request, hasDigest, later);
   return later;
 }
 

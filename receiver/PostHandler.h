@@ -4,10 +4,12 @@
 
 #include <atomic>
 #include <memory>
+#include <optional>
 
 #include "http/Http.h"
 #include "http/LaterReply.h"
 #include "platform/base/Clock.h"
+#include "receiver/CheckThreads.h"
 #include "receiver/DeadLetters.h"
 #include "receiver/Delivery.h"
 #include "receiver/Figures.h"
@@ -22,6 +24,8 @@ class PostHandler final : public http::HttpHandler {
     // What a post gets that can be taken now by neither log nor spool. Of 503 devices without an outbox switch off what
     // posts there: the operator's brake.
     unsigned refuseWith = 429;
+    // Each post is opened, and what is not as the daemon sends it refused.
+    bool opensPosts = false;
   };
   // All outlive this.
   PostHandler(const Settings& settings, Options options, Delivery& delivery, EventLog& log,
@@ -39,6 +43,8 @@ class PostHandler final : public http::HttpHandler {
  private:
   [[nodiscard]] http::Reply reject(const http::Request& request, const Rejection& rejection) const;
   [[nodiscard]] http::Reply refuse(Refusal refusal, const char* text) const;
+  void open(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
+  void deliver(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
   [[nodiscard]] http::Reply replyFor(Fate fate, uint64_t bytes, bool hasDigest) const;
 
   const Settings& settings_;
@@ -51,6 +57,7 @@ class PostHandler final : public http::HttpHandler {
   const PostCheck check_;
   std::atomic<uint64_t> waiting_{0};
   std::atomic<bool> isClosed_{false};
+  std::optional<CheckThreads> checks_;
 };
 
 }  // namespace kyt::receiver

@@ -142,12 +142,13 @@ void drain(HttpServer& server, PostHandler& handler, Log& lines) {
   while (handler.waiting() != 0) std::this_thread::sleep_for(milliseconds(5));
 }
 
-http::ServerOptions serverOptions(const ListenAddress& address, unsigned maxConnections) {
+http::ServerOptions serverOptions(const ListenAddress& address, unsigned maxConnections,
+                                  std::chrono::seconds bodyTime) {
   http::ServerOptions options;
   options.address = address.address;
   options.port = address.port;
   options.maxConnections = maxConnections;
-  options.requestTime = Limits::bodyTime;
+  options.requestTime = bodyTime;
   return options;
 }
 
@@ -172,14 +173,15 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   http::Suspensions suspensions([] {});
 
   std::string error;
-  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections);
+  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings.bodyTime);
   portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
   auto server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
   if (!server) return lines.error("start: %s", error.c_str()), 1;
   sources.server = server.get();
   std::unique_ptr<HttpServer> metrics;
   if (settings.metrics) {
-    http::ServerOptions metricsOptions = serverOptions(*settings.metrics, Limits::maxMetricsConnections);
+    http::ServerOptions metricsOptions =
+        serverOptions(*settings.metrics, Limits::maxMetricsConnections, settings.bodyTime);
     metricsOptions.threads = 1;
     metrics = HttpServer::start(metricsOptions, nullptr, metricsHandler, suspensions, error);
     if (!metrics) return lines.error("start: %s", error.c_str()), 1;

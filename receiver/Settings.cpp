@@ -115,6 +115,9 @@ class Reading {
     });
     table(top, "limits", false, [&](Section& section) {
       section.count("max_body_bytes", settings_.maxBodyBytes, 1024, int64_t{64} << 20);
+      int64_t seconds = settings_.bodyTime.count();
+      section.count("body_seconds", seconds, 1, 3600);
+      settings_.bodyTime = std::chrono::seconds(seconds);
     });
     paths(top);
     top.end();

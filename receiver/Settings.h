@@ -51,6 +51,7 @@ struct Settings {
   std::string spoolPath;
   uint64_t spoolMaxBytes = uint64_t{1} << 30;
   uint64_t maxBodyBytes = 17825792;
+  std::chrono::seconds bodyTime{60};  // for a post to be whole: a slow device holds a connection no longer
   std::vector<PathSettings> paths;
 };
 

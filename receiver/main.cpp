@@ -23,6 +23,7 @@ struct Arguments {
   std::string config = "/etc/kytreceiver/kytreceiver.toml";
   std::string level = "default";
   std::string readyFile;
+  std::string check = "headers";
   int refuseWith = 429;
   bool checkConfig = false, makeStreams = false;
 };
@@ -66,6 +67,7 @@ int run(const Settings& settings, const Arguments& arguments) {
   NatsLog log(settings.log, lines);
   ReceiverOptions options;
   options.posts.refuseWith = static_cast<unsigned>(arguments.refuseWith);
+  options.posts.opensPosts = arguments.check == "full";
   options.readyFile = arguments.readyFile;
   return runReceiver(settings, options, log, signals, lines);
 }
@@ -82,6 +84,11 @@ int main(int argc, char** argv) {
   commandLine.flag("--check-config", arguments.checkConfig, "Say what is wrong with the settings, and end");
   commandLine.flag("--make-streams", arguments.makeStreams,
                    "Make the streams that are missing in the log, and end");
+  commandLine
+      .option("--check", arguments.check,
+              "What is looked at of each post; full: it is opened, and its JSON must be good")
+      .oneOf({"headers", "full"})
+      .showsDefault();
   commandLine
       .option("--refuse-with", arguments.refuseWith,
               "What a post gets that neither log nor spool can take; 503 switches devices off")

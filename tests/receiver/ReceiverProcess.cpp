@@ -47,6 +47,7 @@ bool HttpConnection::send(std::string_view bytes) const {
 }
 
 bool HttpConnection::fill(steady_clock::time_point deadline) {
+  if (!socket_) return false;
   const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
   pollfd waiting{socket_.get(), POLLIN, 0};
   if (::poll(&waiting, 1, static_cast<int>(std::max<long>(left.count(), 0))) <= 0) return false;
@@ -90,8 +91,8 @@ HttpReply HttpConnection::post(std::string_view path, std::string_view body,
   std::string request = "POST " + std::string(path) +
                         " HTTP/1.1\r\nHost: test\r\nContent-Length: " + std::to_string(body.size()) + "\r\n";
   for (const std::string& header : headers) request += header + "\r\n";
-  send(request + "\r\n");
-  send(body);
+  // In one piece: the system would hold a second one back until the first is acknowledged.
+  send((request + "\r\n").append(body));
   return receive();
 }
 
@@ -109,12 +110,12 @@ bool HttpConnection::isClosed(std::chrono::milliseconds timeout) {
 
 ReceiverProcess::ReceiverProcess(Options options) : options_(std::move(options)) {
   const std::string spool = options_.spool.empty() ? folder_ / "spool" : options_.spool;
-  folder_.write("kytreceiver.toml", "listen = \"127.0.0.1:" + std::to_string(options_.port) +
-                                        "\"\nmetrics = \"127.0.0.1:0\"\n" + options_.more +
-                                        "[log]\nkind = \"nats\"\nservers = " + options_.servers + "\n" +
-                                        options_.log + "[spool]\npath = \"" + spool +
-                                        "\"\nmax_bytes = " + std::to_string(options_.spoolMaxBytes) +
-                                        "\n[[path]]\nurl_path = \"/v1/events\"\n" + options_.path);
+  folder_.write("kytreceiver.toml",
+                "listen = \"127.0.0.1:" + std::to_string(options_.port) + "\"\nmetrics = \"127.0.0.1:0\"\n" +
+                    options_.more + "[log]\nkind = \"nats\"\nservers = " + options_.servers + "\n" +
+                    options_.log + "[spool]\npath = \"" + spool +
+                    "\"\nmax_bytes = " + std::to_string(options_.spoolMaxBytes) + "\n[limits]\n" +
+                    options_.limits + "[[path]]\nurl_path = \"/v1/events\"\n" + options_.path);
   start();
 }
 
@@ -131,7 +132,10 @@ void ReceiverProcess::start() {
   arguments.insert(arguments.end(), options_.arguments.begin(), options_.arguments.end());
   tools::ChildProcess::Options how;
   how.outputFile = folder_ / "output";
-  auto started = tools::ChildProcess::start(KYT_RECEIVER, arguments, how);
+  std::vector<std::string> words = options_.wrapper;
+  words.emplace_back(KYT_RECEIVER);
+  words.insert(words.end(), arguments.begin(), arguments.end());
+  auto started = tools::ChildProcess::start(words.front(), {words.begin() + 1, words.end()}, how);
   ASSERT_TRUE(started);
   process_ = std::move(*started);
   isRunning_ = true;

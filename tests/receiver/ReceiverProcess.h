@@ -50,8 +50,11 @@ class ReceiverProcess {
     std::string more;                          // further lines before the sections
     std::string spool;                         // its folder; empty: one of this object's
     uint64_t spoolMaxBytes = 64 << 20;
+    std::string limits;  // further lines of [limits]
     std::vector<std::string> arguments;
     uint16_t port = 0;
+    // A program and its arguments, which run the receiver: none, or what prepares the place for it.
+    std::vector<std::string> wrapper;
   };
   explicit ReceiverProcess(Options options);
   ~ReceiverProcess();  // terminate(); an end other than in order (a sanitizer's finding) fails the test

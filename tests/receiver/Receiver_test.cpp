@@ -2,43 +2,13 @@
 #include <gtest/gtest.h>
 
 #include "http/PostDigest.h"
-#include "tests/receiver/NatsServer.h"
-#include "tests/receiver/ReceiverProcess.h"
-#include "tests/support/Eventually.h"
+#include "tests/receiver/ReceiverTest.h"
 
 namespace kyt::receiver {
 namespace {
 
 constexpr char kKeys[] =
     "digest = \"required\"\ndigest_keys = { \"QPW/videocall\" = [\"6f6c64\", \"6e6577\"] }\n";
-
-class ReceiverTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    if (!NatsServers::isInstalled()) GTEST_SKIP() << "nats-server is not installed";
-    servers_.start();
-    view_.emplace(servers_.url(0));
-  }
-  // With its streams; ready for posts.
-  void start(ReceiverProcess::Options options = {}) {
-    options.servers = servers_.urlsAsToml();
-    if (!receiver_) receiver_.emplace(options);
-    ASSERT_TRUE(receiver_->isReady()) << receiver_->output();
-    makeStreams();
-    ASSERT_TRUE(receiver_->becomesReady()) << receiver_->output();
-  }
-  void makeStreams() const {
-    ASSERT_TRUE(eventually([&] {
-      auto made = tools::ChildProcess::start(KYT_RECEIVER,
-                                             {"--config", receiver_->configFile(), "--make-streams"}, {});
-      return made && made->wait(kTestDeadline) == 0;
-    }));
-  }
-
-  NatsServers servers_;
-  std::optional<StreamView> view_;
-  std::optional<ReceiverProcess> receiver_;
-};
 
 TEST_F(ReceiverTest, AnswersOnceTheLogHasThePostWithItsFacts) {
   start();

@@ -31,6 +31,7 @@ TEST(ReceiverSettings, HaveDefaultsForAllButLogSpoolAndPath) {
   EXPECT_EQ(settings.log.publishTime, std::chrono::seconds(2));
   EXPECT_EQ(settings.spoolMaxBytes, 1073741824U);
   EXPECT_EQ(settings.maxBodyBytes, 17825792U);
+  EXPECT_EQ(settings.bodyTime, std::chrono::seconds(60));
   EXPECT_EQ(settings.paths.at(0).digest, DigestPolicy::none);
 }
 
@@ -54,6 +55,7 @@ path = "/s"
 max_bytes = 2097152
 [limits]
 max_body_bytes = 4096
+body_seconds = 5
 [[path]]
 url_path = "/a"
 digest = "required"
@@ -79,6 +81,7 @@ digest = "optional"
   EXPECT_EQ(settings.spoolPath, "/s");
   EXPECT_EQ(settings.spoolMaxBytes, 2097152U);
   EXPECT_EQ(settings.maxBodyBytes, 4096U);
+  EXPECT_EQ(settings.bodyTime, std::chrono::seconds(5));
   ASSERT_EQ(settings.paths.size(), 2U);
   EXPECT_EQ(settings.paths[0].digest, DigestPolicy::required);
   EXPECT_EQ(settings.paths[0].digestKeys.at("QPW/videocall"),

@@ -113,7 +113,7 @@ class Completion : public ::testing::TestWithParam<Kind> {
 };
 
 TEST_P(Completion, KnowsTheOptionsCommandsAndValuesThatHelpNames) {
-  for (const char* program : {"kytctl", "kytreportingd", "kytdevserver", "kytfeed", "kytdemo"})
+  for (const char* program : {"kytctl", "kytreportingd", "kytreceiver", "kytdevserver", "kytfeed", "kytdemo"})
     expectWhatHelpNames(program);
 }
 

@@ -1,0 +1,22 @@
+// Opens a post and looks whether it is what the daemon sends: JSON with a list of flat records (docs/WIRE-HTTPS.md). Reads it
+// as it is inflated and keeps none of it, so a bomb costs no memory, and not much time. Any thread, no state.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace kyt::receiver {
+
+struct PostProblem {
+  bool isGzip = false;  // it lies in the compression, not in the JSON
+  std::string text;     // a sentence for people
+};
+
+[[nodiscard]] std::optional<PostProblem> problemOfPost(std::string_view body, bool isGzip);
+
+// Bytes that a compressed body of so many may have.
+[[nodiscard]] uint64_t mostInflatedBytes(size_t compressed);
+
+}  // namespace kyt::receiver

@@ -1,0 +1,232 @@
+// What goes wrong around a receiver: hostile posts, processes that die, a log and a disk that are full.
+#include <algorithm>
+#include <atomic>
+#include <cstdio>
+#include <fstream>
+#include <map>
+#include <set>
+#include <string>
+#include <thread>
+
+#include "tests/receiver/Load.h"
+#include "tests/receiver/ReceiverTest.h"
+#include "tests/support/ChildProcess.h"
+
+namespace kyt::receiver {
+namespace {
+
+class ReceiverInTrouble : public ReceiverTest {
+ protected:
+  // What the server has not read of its connections, in bytes.
+  [[nodiscard]] static uint64_t unreadBytes(uint16_t port) {
+    char wanted[32];
+    std::snprintf(wanted, sizeof wanted, " 0100007F:%04X ", port);
+    std::ifstream table("/proc/net/tcp");
+    uint64_t most = 0;
+    for (std::string line; std::getline(table, line);) {
+      if (line.find(wanted) == std::string::npos || line.find(wanted) > 8) continue;
+      const size_t colon = line.find(':', line.find(" 01 "));
+      if (colon != std::string::npos)
+        most = std::max<uint64_t>(most, std::stoull(line.substr(colon + 1, 8), nullptr, 16));
+    }
+    return most;
+  }
+  [[nodiscard]] uint16_t serverPort() const {
+    const std::string url = servers_.url(0);
+    return static_cast<uint16_t>(std::stoi(url.substr(url.rfind(':') + 1)));
+  }
+};
+
+TEST_F(ReceiverInTrouble, OpensPostsWhereItIsToldToAndRefusesBombsAndWrongJSON) {
+  ReceiverProcess::Options options;
+  options.arguments = {"--check", "full"};
+  start(options);
+  const auto post = [&](const std::string& body) {
+    return receiver_->post(body, {"Content-Encoding: gzip"}).status;
+  };
+  EXPECT_EQ(post(gzipped(postText(1))), 200);
+  EXPECT_EQ(post(gzipped("[1]")), 400);
+  EXPECT_EQ(post(gzipped(postText(2)).substr(0, 40)), 400);
+  EXPECT_EQ(post(gzipped(R"({"events":[{"a":")" + std::string(64 << 20, 'x') + "\"}]}")), 400);
+  EXPECT_EQ(view_->messages(), 1U);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-json\"}"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-gzip\"}"), 2);
+}
+
+TEST_F(ReceiverInTrouble, ASlowBodyOrSlowHeadersAreCutOffAndSlowNobodyElse) {
+  ReceiverProcess::Options options;
+  options.limits = "body_seconds = 2\n";
+  start(options);
+  // One is silent, one sends a byte now and then: neither is whole in time.
+  HttpConnection silent(receiver_->port()), dribbling(receiver_->port());
+  for (HttpConnection* connection : {&silent, &dribbling})
+    connection->send("POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: 100000\r\n\r\n{");
+  std::atomic<bool> isOver{false};
+  std::thread bytes([&] {
+    while (!isOver && dribbling.send("x")) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  });
+  for (uint64_t i = 0; i < 50; ++i) {
+    const HttpReply reply = receiver_->post(postText(i));
+    EXPECT_EQ(reply.status, 200);
+    EXPECT_LT(reply.took, std::chrono::seconds(1));
+  }
+  EXPECT_TRUE(silent.isClosed());
+  EXPECT_TRUE(dribbling.isClosed());
+  isOver = true;
+  bytes.join();
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_refused_total{reason=\"too-slow\"}") == 2; }))
+      << receiver_->get("/metrics").body;
+  EXPECT_EQ(view_->messages(), 50U);
+}
+
+TEST_F(ReceiverInTrouble, AConnectionThatEndsInTheMiddleOfAPostIsCounted) {
+  start();
+  {
+    HttpConnection cut(receiver_->port());
+    cut.send("POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: 1000\r\n\r\n{");
+    ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_bodies_bytes") == 1; }));
+  }
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_refused_total{reason=\"cut-off\"}") == 1; }));
+  EXPECT_EQ(receiver_->metric("kyt_bodies_bytes"), 0);
+}
+
+TEST_F(ReceiverInTrouble, KilledBetweenPublicationAndAnswerARepeatIsStoredOnce) {
+  start();
+  const std::string body = postText(1, 3000);
+  servers_.pause(0);
+  HttpConnection device(receiver_->port());
+  device.send("POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: " + std::to_string(body.size()) +
+              "\r\n\r\n" + body);
+  ASSERT_TRUE(eventually([&] { return unreadBytes(serverPort()) > body.size(); })) << "not published";
+  receiver_->kill();
+  servers_.resume(0);
+  EXPECT_TRUE(device.isClosed());
+  ASSERT_TRUE(eventually([&] { return view_->messages() == 1U; }));
+  receiver_->start();
+  ASSERT_TRUE(receiver_->becomesReady());
+  EXPECT_EQ(receiver_->post(body).status, 200);
+  EXPECT_EQ(view_->messages(), 1U);
+  EXPECT_EQ(receiver_->metric("kyt_duplicates_total"), 1);
+}
+
+TEST_F(ReceiverInTrouble, KilledUnderLoadNoAnsweredPostIsLostAndNoneIsStoredTwice) {
+  ReceiverProcess::Options options;
+  options.port = freePort();
+  start(options);
+  Load load({{receiver_->port()}});
+  for (uint64_t times = 1; times <= 3; ++times) {
+    ASSERT_TRUE(eventually([&] { return load.answered() > 200 * times; }));
+    receiver_->kill();
+    receiver_->start();
+  }
+  ASSERT_TRUE(eventually([&] { return load.answered() > 1000; }));
+  load.stop();
+  EXPECT_TRUE(spoolBecomesEmpty());
+  const auto stored = view_->ids();
+  EXPECT_EQ(load.missingIn(stored), 0U) << "of " << load.taken().size();
+  for (const auto& [id, times] : stored) EXPECT_EQ(times, 1) << id;
+  EXPECT_TRUE(load.others().empty());
+}
+
+TEST_F(ReceiverInTrouble, ToldToEndUnderLoadItLosesNoAnsweredPost) {
+  ReceiverProcess::Options options;
+  options.port = freePort();
+  const TemporaryFolder folder;
+  options.spool = folder / "spool";
+  start(options);
+  Load load({{receiver_->port()}});
+  ASSERT_TRUE(eventually([&] { return load.answered() > 300; }));
+  EXPECT_EQ(receiver_->terminate(), 0) << receiver_->output();
+  // With the log's server stopped, too: what is on its way goes to the spool before the end.
+  receiver_->start();
+  const uint64_t before = load.answered();
+  ASSERT_TRUE(eventually([&] { return load.answered() > before + 300; }));
+  servers_.pause(0);
+  EXPECT_EQ(receiver_->terminate(), 0) << receiver_->output();
+  servers_.resume(0);
+  load.stop();
+  receiver_->start();
+  ASSERT_TRUE(receiver_->becomesReady());
+  EXPECT_TRUE(spoolBecomesEmpty());
+  const auto stored = view_->ids();
+  EXPECT_EQ(load.missingIn(stored), 0U) << "of " << load.taken().size();
+  for (const auto& [id, times] : stored) EXPECT_EQ(times, 1) << id;
+}
+
+TEST_F(ReceiverInTrouble, WithTheStreamFullItSpoolsAndWithTheSpoolFullItRefusesWith429) {
+  ReceiverProcess::Options options;
+  options.spoolMaxBytes = 2 << 20;
+  start(options);
+  ASSERT_TRUE(view_->setMaxBytes(1 << 20));
+  std::map<int, int> statuses;
+  std::set<std::string> taken;
+  for (uint64_t i = 0; i < 40 && statuses[429] < 5; ++i) {
+    const std::string body = postText(i, 100000);
+    const HttpReply reply = receiver_->post(body);
+    ++statuses[reply.status];
+    if (reply.status == 200) taken.insert(body);
+    if (reply.status == 429) {
+      EXPECT_NE(reply.headers.find("retry-after"), reply.headers.end());
+    }
+  }
+  EXPECT_EQ(statuses[200] + statuses[429], statuses[200] + 5) << "no other answer";
+  EXPECT_GT(statuses[200], 25);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"spool-full\"}"), 5);
+  EXPECT_EQ(receiver_->get("/readyz").status, 503);
+  ASSERT_TRUE(view_->setMaxBytes(-1));
+  EXPECT_TRUE(spoolBecomesEmpty());
+  EXPECT_EQ(receiver_->get("/readyz").status, 200);
+  EXPECT_EQ(receiver_->post(postText(1000)).status, 200);
+  EXPECT_EQ(view_->messages(), taken.size() + 1);
+}
+
+TEST_F(ReceiverInTrouble, WithTheSpoolsDiskFullItRefusesWith429AndGoesOnWhenTheLogTakesPostsAgain) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "this user may mount nothing";
+  const TemporaryFolder folder;
+  ReceiverProcess::Options options;
+  options.spool = folder.path();
+  options.wrapper = {
+      "unshare",    "--mount", "sh", "-c", "mount -t tmpfs -o size=4m none \"$0\" && exec \"$@\"",
+      folder.path()};
+  start(options);
+  ASSERT_TRUE(view_->setMaxBytes(1 << 20));
+  int taken = 0, refused = 0;
+  for (uint64_t i = 0; i < 100 && refused < 5; ++i) {
+    const int status = receiver_->post(postText(i, 100000)).status;
+    ASSERT_TRUE(status == 200 || status == 429) << status;
+    ++(status == 200 ? taken : refused);
+  }
+  EXPECT_EQ(refused, 5);
+  EXPECT_GT(taken, 15);
+  EXPECT_GE(receiver_->metric("kyt_refused_total{reason=\"spool-broken\"}"), 5);
+  ASSERT_TRUE(view_->setMaxBytes(-1));
+  EXPECT_TRUE(eventually([&] { return receiver_->post(postText(1000)).status == 200; }));
+  EXPECT_TRUE(spoolBecomesEmpty()) << receiver_->output();
+  EXPECT_EQ(view_->messages(), static_cast<uint64_t>(taken) + 1);
+}
+
+TEST_F(ReceiverInTrouble, WithTheBrakeOnItRefusesWith503) {
+  ReceiverProcess::Options options;
+  options.spoolMaxBytes = 1 << 20;
+  options.arguments = {"--refuse-with", "503"};
+  start(options);
+  ASSERT_TRUE(view_->setMaxBytes(1 << 20));
+  EXPECT_TRUE(eventually(
+      [&, i = uint64_t{0}]() mutable { return receiver_->post(postText(i++, 300000)).status == 503; }));
+}
+
+TEST_F(ReceiverInTrouble, ASecondReceiverOnTheSameSpoolDoesNotStart) {
+  const TemporaryFolder folder;
+  ReceiverProcess::Options options;
+  options.servers = servers_.urlsAsToml();
+  options.spool = folder / "spool";
+  receiver_.emplace(options);
+  ASSERT_TRUE(receiver_->isReady());
+  ReceiverProcess second(options);
+  EXPECT_FALSE(second.isReady());
+  EXPECT_NE(second.output().find("another receiver has the folder"), std::string::npos);
+  second.kill();
+}
+
+}  // namespace
+}  // namespace kyt::receiver
