@@ -14,6 +14,11 @@ bool isNumberUpTo(const Value& value, uint64_t most) {
          value.longLongValue() >= 0 && static_cast<uint64_t>(value.longLongValue()) <= most;
 }
 
+const char* fateOf(const PassedEvent& event) {
+  if (event.dropped) return reasonName(*event.dropped);
+  return event.isKept ? "in-outbox" : "delivered";
+}
+
 }  // namespace
 
 // A key that nobody knows is refused: who misspells one would watch what he did not mean to.
@@ -50,7 +55,7 @@ Dictionary passedView(const PassedEvent& event, bool bodies) {
                   {"service", event.program.service},
                   {"backEnd", event.backEnd},
                   {"internal", event.isInternal},
-                  {"fate", event.dropped ? reasonName(*event.dropped) : "delivered"}};
+                  {"fate", fateOf(event)}};
   if (event.kind.category >= 0) view.set("category", event.kind.category);
   if (event.kind.type >= 0) view.set("type", event.kind.type);
   if (event.rule[0] != '\0') view.set("rule", event.rule);

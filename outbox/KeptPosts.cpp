@@ -63,7 +63,61 @@ KeptPosts::Entry* KeptPosts::find(int64_t number) {
 }
 
 KeptPosts::Entry* KeptPosts::oldestOf(ServerLine& line) {
-  return firstFrom(entries_, line.from, [&line](const Entry& entry) { return entry.line == &line; });
+  return firstFrom(entries_, line.from,
+                   [&line](const Entry& entry) { return entry.line == &line && !entry.isAside; });
+}
+
+KeptPosts::Entry* KeptPosts::dueAside(ServerLine& line, MonotonicTime now, const Entry* before) {
+  for (const auto& [number, aside] : line.aside) {
+    if (before != nullptr && before->number < number) break;
+    if (aside.strikes != 0 ? now < aside.notBefore : aside.wasTried) continue;
+    if (Entry* entry = find(number); entry != nullptr && !entry->isInFlight) return entry;
+  }
+  return nullptr;
+}
+
+KeptPosts::Entry* KeptPosts::next(ServerLine& line, MonotonicTime now) {
+  Entry* oldest = oldestOf(line);
+  if (Entry* aside = dueAside(line, now, oldest)) return aside;
+  if (oldest != nullptr || line.inFlight != 0) return oldest;
+  comeBack(line);  // all were tried
+  return dueAside(line, now, nullptr);
+}
+
+std::optional<MonotonicTime> KeptPosts::whenDue(const ServerLine& line) {
+  std::optional<MonotonicTime> soonest;
+  if (line.posts > line.aside.size()) return soonest;
+  for (const auto& [number, aside] : line.aside) {
+    if (aside.strikes == 0) return std::nullopt;
+    soonest = std::min(soonest.value_or(aside.notBefore), aside.notBefore);
+  }
+  return soonest;
+}
+
+// A post that failed once may have met a server that fails. One that fails again, after the server took another, is the
+// reason itself.
+ServerLine::Aside* KeptPosts::standAsideOrStrike(Entry& entry) {
+  ServerLine& line = *entry.line;
+  const auto known = line.aside.find(entry.number);
+  if (known != line.aside.end()) {
+    if (known->second.strikes != 0 || line.failures == 0) return &known->second;
+    known->second.wasTried = true;
+    return nullptr;
+  }
+  if (line.aside.size() >= kMostAside) {
+    comeBack(line);
+    return nullptr;
+  }
+  line.aside[entry.number] = {};
+  entry.isAside = true;
+  return nullptr;
+}
+
+void KeptPosts::comeBack(ServerLine& line, bool all) {
+  for (auto& [number, aside] : line.aside) {
+    aside.wasTried = false;
+    if (all) aside.notBefore = MonotonicTime();
+  }
 }
 
 KeptPosts::Entry* KeptPosts::oldestOfUser(uint32_t user) {
@@ -87,6 +141,8 @@ void KeptPosts::setInFlight(Entry& entry, bool isInFlight) {
 
 void KeptPosts::remove(Entry& entry) {
   entry.isGone = true;
+  if (entry.isAside) entry.line->aside.erase(entry.number);
+  entry.isAside = false;
   --size_;
   bytes_ -= entry.bytes;
   byConsent_ -= entry.isByConsent ? 1 : 0;

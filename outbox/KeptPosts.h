@@ -2,11 +2,13 @@
 // each user's counted. Some 40 bytes a post. Used by Outbox, on its queue.
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <deque>
 #include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -18,6 +20,12 @@ class URLSession;
 
 // The posts to one server, and how it has answered of late.
 struct ServerLine {
+  // A post that failed although it left, so that it may be the reason itself: the line goes on with the next one.
+  struct Aside {
+    bool wasTried = true;       // since the server took one
+    unsigned strikes = 0;       // times that it failed while the server took others
+    MonotonicTime notBefore{};  // with strikes: its own next try
+  };
   // Posts of two identities never share a connection.
   struct Sender {
     std::string identity, sourceApplication;
@@ -30,10 +38,15 @@ struct ServerLine {
   unsigned failures = 0;       // in a row
   bool isOpen = false;         // the last one was taken: several may go at a time
   bool isUnreachable = false;  // it failed without an answer
+  int lastStatus = 0;          // 0: none yet, or no answer came
   MonotonicTime nextTry{}, lastTry{};
   MonotonicTime notBefore{};  // says the server
+  bool isHastened = false;    // the next try is sooner since the server took a new post
+  unsigned hastened = 0;      // such tries that failed, in a row
   size_t inFlight = 0;
   std::vector<Sender> senders;
+  std::map<int64_t, Aside> aside;  // by number
+  unsigned newStrikes = 0;         // since the server took one
 };
 
 class KeptPosts {
@@ -43,15 +56,31 @@ class KeptPosts {
     ServerLine* line = nullptr;
     int64_t born = 0;  // monotonic seconds
     uint32_t bytes = 0, user = 0;
-    bool isByConsent = false, isInFlight = false, isGone = false;
+    bool isByConsent = false, isInFlight = false, isGone = false, isAside = false;
   };
 
   // `number` is greater than all before. The line is made where there is none.
   Entry& add(int64_t number, const std::string& server, uint64_t bytes, uint32_t user, bool isByConsent,
              int64_t born);
   [[nodiscard]] Entry* find(int64_t number);  // null: not there, or gone
-  // The oldest that nobody is sending: of a line, of a user, of all; null: none.
-  [[nodiscard]] Entry* oldestOf(ServerLine& line);
+  // What is to be sent next; null: none now. The oldest, but for those that stand aside and are not due.
+  [[nodiscard]] Entry* next(ServerLine& line, MonotonicTime now);
+  // When one of those that stand aside is due, where there is nothing else to send; none: there is.
+  [[nodiscard]] static std::optional<MonotonicTime> whenDue(const ServerLine& line);
+  // It failed and may have left: it stands aside. False: it fails alone, which says nothing about the server, and its next
+  // try is its own, after pause(strikes).
+  template <typename Pause>
+  [[nodiscard]] bool standAside(Entry& entry, MonotonicTime now, Pause pause) {
+    ServerLine::Aside* failingAlone = standAsideOrStrike(entry);
+    if (failingAlone == nullptr) return true;
+    const bool isNew = failingAlone->strikes == 0;
+    failingAlone->notBefore = now + pause(failingAlone->strikes++);
+    // Many in a row say that the server fails after all.
+    return isNew && ++entry.line->newStrikes % kMostNewStrikes == 0;
+  }
+  // The server took one: those that stand aside come again, in their order. `all`: also those that wait for their own time.
+  static void comeBack(ServerLine& line, bool all = false);
+  // The oldest that nobody is sending, of a user, of all; null: none.
   [[nodiscard]] Entry* oldestOfUser(uint32_t user);
   [[nodiscard]] Entry* oldest();
   void setInFlight(Entry& entry, bool isInFlight);
@@ -78,7 +107,13 @@ class KeptPosts {
     size_t posts = 0;
     int64_t from = 0;
   };
+  static constexpr size_t kMostAside = 1024;  // of a line; each takes some 80 bytes
+  static constexpr unsigned kMostNewStrikes = 8;
   void count(Entry& entry);
+  [[nodiscard]] Entry* oldestOf(ServerLine& line);
+  [[nodiscard]] Entry* dueAside(ServerLine& line, MonotonicTime now, const Entry* before);
+  // Null where its failure tells nothing of it alone.
+  [[nodiscard]] static ServerLine::Aside* standAsideOrStrike(Entry& entry);
 
   std::deque<Entry> entries_;
   std::map<std::string, ServerLine> lines_;

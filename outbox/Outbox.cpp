@@ -118,6 +118,8 @@ void Outbox::turn() {
   if (isLoaded_) {
     forgetWithoutConsent();
     forgetTooOld();
+    // By itself, so that a log that cannot be cut short says nothing of what is new.
+    if (removesForGood_) commit(Plan());
   }
   keepAll(std::move(inbox.posts));
   {
@@ -130,6 +132,7 @@ void Outbox::turn() {
     if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) ports_.store.becameEmpty();
   }
   posts_.forgetGone();
+  books_.forgetUnwatched();
   size_.store(posts_.size(), std::memory_order_relaxed);
   if (isClosed_) return ports_.store.close();
   sendWhatIsDue();
@@ -175,14 +178,16 @@ void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
     sending->second->isAbandoned = true;
     if (sending->second->task) sending->second->task->cancel();
   }
-  books_.drop(events, fate);
+  books_.drop(entry.number, events, fate);
   removed_.push_back(entry.number);
   posts_.remove(entry);
 }
 
 void Outbox::forgetWithoutConsent() {
-  isConsentGiven_ = ports_.consent.isSubmissionAllowed();
-  if (isConsentGiven_ || posts_.byConsent() == 0) return;
+  const bool wasGiven = std::exchange(isConsentGiven_, ports_.consent.isSubmissionAllowed());
+  if (isConsentGiven_) return;
+  if (wasGiven) ports_.store.removeSetAside();  // nobody knows what is in it
+  if (posts_.byConsent() == 0) return;
   ports_.log.normal("Outbox: The consent is withdrawn, %zu posts that were collected by it are deleted",
                     posts_.byConsent());
   for (KeptPosts::Entry& entry : posts_.entries())
@@ -282,7 +287,8 @@ void Outbox::commit(Plan plan) {
 }
 
 void Outbox::kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced) {
-  for (const OutboxBooks::Events& events : displaced) books_.drop(events, Reason::outboxDisplaced);
+  for (size_t i = 0; i < displaced.size(); ++i)
+    books_.drop(plan.displaced[i], displaced[i], Reason::outboxDisplaced);
   if (!displaced.empty() &&
       ports_.counters.addAndMayLog(Reason::outboxDisplaced, ports_.clock.monotonic(), 0))
     ports_.log.error("Outbox(keep): It is full, %zu of the oldest posts are lost for newer ones",
@@ -290,11 +296,13 @@ void Outbox::kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced)
   for (Incoming& incoming : plan.posts) {
     last_ = incoming.failed.post.number;
     const StoredPost& post = incoming.failed.post;
-    books_.enter(incoming.failed.booked.get(), post.events);
+    books_.enter(last_, incoming.failed.booked, post.events, incoming.failed.status);
     if (incoming.failed.mayHaveLeft)
       tellOwner(post.url, post.events, post.body.view().size(), !incoming.failed.isUnanswered);
     ServerLine& line = *posts_.find(last_)->line;
+    line.lastStatus = incoming.failed.status;
     // What is being sent says by itself how the server is.
+    if (line.posts == 1 && line.inFlight == 0) line.failures = 0;
     if (line.inFlight == 0 && line.failures == 0)
       fail(line, incoming.failed.retryAfter, incoming.failed.isUnanswered);
     else if (line.failures != 0 && incoming.failed.retryAfter)
@@ -319,7 +327,9 @@ void Outbox::handle(const PostStoreProblem& problem) {
     for (auto& [number, sending] : inFlight_) sending->isAbandoned = true;
     posts_.clear();
     removed_.clear();
+    removesForGood_ = false;
     books_.dropRest(Reason::outboxUnreadable);
+    if (!isConsentGiven_) ports_.store.removeSetAside();
     return;
   }
   {

@@ -41,6 +41,7 @@ struct FailedPost {
   std::shared_ptr<const BookedEvents> booked;  // whose they are; null: nobody's
   std::optional<Duration> retryAfter;
   bool isUnanswered = false, mayHaveLeft = true;
+  int status = 0;  // 0: unanswered
 };
 
 class Outbox final : public std::enable_shared_from_this<Outbox> {
@@ -60,11 +61,17 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   };
   // Of one server's line, for people.
   struct Server {
+    struct User {
+      uint64_t posts = 0, bytes = 0;
+    };
     std::string server;
     uint64_t posts = 0, bytes = 0, inFlight = 0;
-    unsigned failures = 0;    // in a row
-    Duration oldest{};        // age
-    Duration untilNextTry{};  // 0: now
+    uint64_t failingAlone = 0;  // posts that it failed while it took others
+    unsigned failures = 0;      // in a row
+    int lastStatus = 0;         // 0: no answer came
+    Duration oldest{};          // age
+    Duration untilNextTry{};    // 0: now
+    std::map<uint32_t, User> users;
   };
   // What an administrator drops: all where nothing is said.
   struct Filter {
@@ -126,6 +133,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
     PostVerdict verdict = PostVerdict::sendAgain;
     std::optional<Duration> retryAfter;
     bool isUnanswered = false, mayHaveLeft = true;
+    int status = 0;  // 0: unanswered
   };
   // What came from other threads since the last turn.
   struct Inbox {
@@ -153,8 +161,13 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
                  bool isAnswered);
   void takeNews(const Inbox& inbox) REQUIRES(*queue_);
   void fail(ServerLine& line, std::optional<Duration> pause, bool isUnanswered) REQUIRES(*queue_);
+  void failAgain(KeptPosts::Entry& entry, const Answer& answer) REQUIRES(*queue_);
   void pause(ServerLine& line, Duration length) REQUIRES(*queue_);
-  void hasten(ServerLine& line) REQUIRES(*queue_);
+  // False: it has no effect.
+  bool hasten(ServerLine& line, Duration sinceLastTry) REQUIRES(*queue_);
+  void hearGood(ServerLine& line) REQUIRES(*queue_);
+  void takes(ServerLine& line) REQUIRES(*queue_);
+  [[nodiscard]] Duration pauseAfter(unsigned failures);
   void forgetWithoutConsent() REQUIRES(*queue_);
   void forgetTooOld() REQUIRES(*queue_);
   void leave(KeptPosts::Entry& entry, Reason fate) REQUIRES(*queue_);
@@ -199,7 +212,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   bool removesForGood_ GUARDED_BY(*queue_) = false;
   int64_t last_ GUARDED_BY(*queue_) = 0;
   bool isLoaded_ GUARDED_BY(*queue_) = false, isWatching_ GUARDED_BY(*queue_) = false;
-  bool isClosed_ GUARDED_BY(*queue_) = false, isConsentGiven_ GUARDED_BY(*queue_) = false;
+  bool isClosed_ GUARDED_BY(*queue_) = false, isConsentGiven_ GUARDED_BY(*queue_) = true;
   TimerHandle timer_ GUARDED_BY(*queue_);
 };
 

@@ -2,6 +2,8 @@
 
 #include <algorithm>
 
+#include "platform/base/Limits.h"
+
 namespace kyt {
 
 OutboxBooks::Held& OutboxBooks::held(const BookRowName& row) {
@@ -18,8 +20,12 @@ void OutboxBooks::restore(const Events& events) {
   }
 }
 
-void OutboxBooks::enter(const BookedEvents* booked, const Events& events) {
-  if (booked != nullptr) booked->keep();
+void OutboxBooks::enter(int64_t post, const std::shared_ptr<const BookedEvents>& booked, const Events& events,
+                        int status) {
+  if (booked != nullptr) {
+    booked->keep(status);
+    if (booked->areShown() && watched_.size() < Limits::maxWatchedKeptPosts) watched_[post] = booked;
+  }
   for (const auto& [row, count] : events) held(row).events += count;
 }
 
@@ -36,21 +42,46 @@ void OutboxBooks::leave(const Events& events, Operation operation) {
   }
 }
 
-void OutboxBooks::deliver(const Events& events) {
+void OutboxBooks::deliver(int64_t post, const Events& events, int status) {
+  tellWatchers(post, events, std::nullopt, status);
   leave(events, [](Tally& tally, uint64_t count) { tally.deliver(count); });
 }
 
-void OutboxBooks::drop(const Events& events, Reason fate) {
+void OutboxBooks::drop(int64_t post, const Events& events, Reason fate, int status) {
+  tellWatchers(post, events, fate, status);
   leave(events, [this, fate](Tally& tally, uint64_t count) {
     counters_.add(fate, count);
     tally.drop(fate, count);
   });
 }
 
+void OutboxBooks::tellWatchers(int64_t post, const Events& events, std::optional<Reason> dropped,
+                               int status) {
+  if (!books_.watchers()->anybody()) return;
+  if (const auto known = watched_.find(post); known != watched_.end()) {
+    known->second->tellEnd(dropped, status);
+    watched_.erase(known);
+    return;
+  }
+  for (const auto& [row, count] : events) {
+    const auto known = held_.find(row);
+    if (known == held_.end()) continue;
+    PassedEvent event = known->second.tally->passed(EventKind(), dropped);
+    event.backEnd = row.backEnd;
+    for (uint64_t left = std::min(count, known->second.events); left > 0; --left)
+      books_.watchers()->tell(event);
+  }
+}
+
+void OutboxBooks::forgetUnwatched() {
+  if (!watched_.empty() && !books_.watchers()->anybody()) watched_.clear();
+}
+
 void OutboxBooks::dropRest(Reason fate) {
   Events rest;
   for (const auto& [row, held] : held_) rest.push_back({row, held.events});
-  drop(rest, fate);
+  if (!rest.empty()) drop(0, rest, fate);
+  watched_.clear();
 }
 
 }  // namespace kyt

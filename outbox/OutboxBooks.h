@@ -1,9 +1,11 @@
-// The outbox's part of the books: whose events lie in it. Used by Outbox, on its queue.
+// The outbox's part of the books: whose events lie in it. It also tells watchers what became of them; of which category they
+// were only where somebody watched when they were kept. Used by Outbox, on its queue.
 #pragma once
 
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <optional>
 #include <vector>
 
 #include "platform/base/Books.h"
@@ -19,12 +21,16 @@ class OutboxBooks {
 
   // An earlier process kept them.
   void restore(const Events& events);
-  // They came from their back end; null: of no back end.
-  void enter(const BookedEvents* booked, const Events& events);
-  void deliver(const Events& events);
-  void drop(const Events& events, Reason fate);
+  // They came from their back end, whose post got that status; null: of no back end.
+  void enter(int64_t post, const std::shared_ptr<const BookedEvents>& booked, const Events& events,
+             int status);
+  // `status`: of the answer, 0: there was none.
+  void deliver(int64_t post, const Events& events, int status);
+  void drop(int64_t post, const Events& events, Reason fate, int status = 0);
   // All that are left, whatever they were: no post is.
   void dropRest(Reason fate);
+  // Nobody watches any more.
+  void forgetUnwatched();
 
  private:
   struct Held {
@@ -35,10 +41,12 @@ class OutboxBooks {
   // Those of them that are still held: a file that was damaged may say anything.
   template <typename Operation>
   void leave(const Events& events, Operation operation);
+  void tellWatchers(int64_t post, const Events& events, std::optional<Reason> dropped, int status);
 
   Books& books_;
   Counters& counters_;
   std::map<BookRowName, Held> held_;
+  std::map<int64_t, std::shared_ptr<const BookedEvents>> watched_;  // Limits::maxWatchedKeptPosts at most
 };
 
 }  // namespace kyt

@@ -20,14 +20,17 @@ constexpr Duration kBetweenTries = std::chrono::seconds(5);
 }  // namespace
 
 // A random time up to a limit that doubles with each failure: devices that failed together do not come back together.
+Duration Outbox::pauseAfter(unsigned failures) {
+  const auto most = std::min(kFirstPause * (1U << std::min(failures, kMostDoublings)), kLongestPause);
+  return std::chrono::milliseconds(ports_.random.uniform(static_cast<uint32_t>(most.count()) + 1));
+}
+
 void Outbox::fail(ServerLine& line, std::optional<Duration> length, bool isUnanswered) {
   const MonotonicTime now = ports_.clock.monotonic();
   line.isOpen = false;
   line.isUnreachable = isUnanswered;
-  const unsigned doublings = std::min(line.failures, kMostDoublings);
-  const auto most = std::min(kFirstPause * (1U << doublings), kLongestPause);
-  const Duration random =
-      std::chrono::milliseconds(ports_.random.uniform(static_cast<uint32_t>(most.count()) + 1));
+  if (std::exchange(line.isHastened, false)) ++line.hastened;
+  const Duration random = pauseAfter(line.failures);
   // Several that were on their way failed together: that is one failure.
   const bool isAnother = line.failures == 0 || now >= line.nextTry;
   if (isAnother) {
@@ -43,10 +46,20 @@ void Outbox::pause(ServerLine& line, Duration length) {
 }
 
 // There is reason to try before the time has come.
-void Outbox::hasten(ServerLine& line) {
+bool Outbox::hasten(ServerLine& line, Duration sinceLastTry) {
   const MonotonicTime soonest =
-      std::max({ports_.clock.monotonic(), line.lastTry + kBetweenTries, line.notBefore});
-  line.nextTry = std::min(line.nextTry, soonest);
+      std::max({ports_.clock.monotonic(), line.lastTry + sinceLastTry, line.notBefore});
+  if (line.nextTry <= soonest) return false;
+  line.nextTry = soonest;
+  return true;
+}
+
+// A server that takes new posts and goes on failing what is left here is asked less and less often too.
+void Outbox::hearGood(ServerLine& line) {
+  takes(line);
+  const Duration pause =
+      std::min<Duration>(kBetweenTries * (1U << std::min(line.hastened, kMostDoublings)), kLongestPause);
+  line.isHastened = hasten(line, pause) || line.isHastened;
 }
 
 void Outbox::take(Answer& answer) {
@@ -61,24 +74,46 @@ void Outbox::take(Answer& answer) {
   KeptPosts::Entry* entry = sending.isAbandoned ? nullptr : posts_.find(sending.number);
   if (entry == nullptr) return;
   posts_.setInFlight(*entry, false);
+  line.lastStatus = answer.status;
   if (answer.verdict == PostVerdict::sendAgain) {
-    if (!isStopping_) fail(line, answer.retryAfter, answer.isUnanswered);
+    if (!isStopping_) failAgain(*entry, answer);
     return;
   }
   if (answer.verdict == PostVerdict::taken) {
     if (line.failures > 1) ports_.log.normal("Outbox: %s takes posts again", line.server.c_str());
     line.isOpen = true;
-    books_.deliver(sending.events);
+    books_.deliver(sending.number, sending.events, answer.status);
   } else {
     const bool isRedirected = answer.verdict == PostVerdict::redirected;
     ports_.counters.add(isRedirected ? Reason::requestRedirected : Reason::requestRefused);
-    books_.drop(sending.events, isRedirected ? Reason::postRedirected : Reason::postRefused);
+    books_.drop(sending.number, sending.events, isRedirected ? Reason::postRedirected : Reason::postRefused,
+                answer.status);
   }
   removed_.push_back(sending.number);
   posts_.remove(*entry);
   if (answer.verdict == PostVerdict::braked) return fail(line, answer.retryAfter, false);
-  line.failures = 0;
+  line.failures = line.hastened = 0;
+  line.isHastened = false;
   line.nextTry = line.notBefore = ports_.clock.monotonic();
+  takes(line);
+}
+
+// A post that never left is not the reason itself: it stays the first. Of one that did nobody knows, so the next one is
+// tried; a post that its server alone does not take holds nobody up.
+void Outbox::failAgain(KeptPosts::Entry& entry, const Answer& answer) {
+  ServerLine& line = *entry.line;
+  const bool saysSomething =
+      !answer.mayHaveLeft || posts_.standAside(entry, ports_.clock.monotonic(),
+                                               [this](unsigned strikes) { return pauseAfter(strikes); });
+  if (saysSomething)
+    fail(line, answer.retryAfter, answer.isUnanswered);
+  else if (answer.retryAfter)
+    pause(line, *answer.retryAfter);
+}
+
+void Outbox::takes(ServerLine& line) {
+  line.newStrikes = 0;
+  KeptPosts::comeBack(line);
 }
 
 // The programs' parts of a message are as large as they have events.
@@ -98,13 +133,15 @@ void Outbox::tellOwner(const std::string& url, const OutboxBooks::Events& events
 void Outbox::takeNews(const Inbox& inbox) {
   const MonotonicTime now = ports_.clock.monotonic();
   for (const std::string& server : inbox.answering)
-    if (ServerLine* line = posts_.line(server)) hasten(*line);
+    if (ServerLine* line = posts_.line(server)) hearGood(*line);
   if (!inbox.connectivityChanged && !inbox.flush) return;
   for (auto& [server, line] : posts_.lines()) {
-    if (inbox.flush)
+    if (inbox.flush) {
       line.nextTry = line.notBefore = now;
-    else if (line.isUnreachable)
-      hasten(line);
+      KeptPosts::comeBack(line, true);
+    } else if (line.isUnreachable) {
+      hasten(line, kBetweenTries);
+    }
   }
 }
 
@@ -119,8 +156,15 @@ void Outbox::sendFrom(ServerLine& line) {
   const size_t most = line.isOpen ? kMostAtATime : 1;
   while (line.inFlight < most && ports_.clock.monotonic() >= line.nextTry) {
     if (line.inFlight > 0 && bytesInFlight_ >= Limits::maxOutboxBytesInFlight) return;
-    KeptPosts::Entry* next = posts_.oldestOf(line);
-    if (next == nullptr || !send(*next)) return;
+    if (inFlight_.size() >= Limits::maxOutboxRequestsInFlight) return;
+    const MonotonicTime now = ports_.clock.monotonic();
+    KeptPosts::Entry* next = posts_.next(line, now);
+    if (next == nullptr) {
+      if (const auto due = KeptPosts::whenDue(line); due && line.inFlight == 0)
+        line.nextTry = std::max(*due, now);
+      return;
+    }
+    if (!send(*next)) return;
   }
 }
 
@@ -186,7 +230,8 @@ bool Outbox::send(KeptPosts::Entry& entry) {
           MutexLock lock(self->mutex_);
           self->inbox_.answers.push_back({std::move(answer), verdictOf(answered, error ? &*error : nullptr),
                                           retryAfter(answered, self->ports_.clock.timeOfDay()),
-                                          answered == nullptr, mayHaveLeft(response, error)});
+                                          answered == nullptr, mayHaveLeft(response, error),
+                                          answered != nullptr ? answered->status : 0});
         }
         self->wake();
       });
@@ -202,7 +247,7 @@ void Outbox::setTimer() {
     next = now + kDiskPause;
   } else if (!isStopping_) {
     for (const auto& [server, line] : posts_.lines())
-      if (line.posts != 0 && line.inFlight == 0) next = std::min(next, line.nextTry);
+      if (line.posts != 0 && line.inFlight == 0 && line.nextTry > now) next = std::min(next, line.nextTry);
   }
   timer_ =
       ports_.timers.after(std::max<Duration>(next - now, Duration(0)), queue_, [weak = weak_from_this()] {
@@ -250,15 +295,27 @@ std::vector<Outbox::Server> Outbox::list() {
   return queue_->sync([this] {
     queue_->assertCurrent();
     const MonotonicTime now = ports_.clock.monotonic();
-    std::map<const ServerLine*, int64_t> oldest;
-    for (const KeptPosts::Entry& entry : posts_.entries())
-      if (!entry.isGone) oldest.emplace(entry.line, entry.born);
+    std::map<const ServerLine*, Server> lines;
+    for (const KeptPosts::Entry& entry : posts_.entries()) {
+      if (entry.isGone) continue;
+      Server& server = lines[entry.line];
+      if (server.users.empty()) server.oldest = std::chrono::seconds(seconds() - entry.born);
+      Server::User& user = server.users[entry.user];
+      ++user.posts;
+      user.bytes += entry.bytes;
+    }
     std::vector<Server> servers;
-    for (const auto& [name, line] : posts_.lines()) {
+    for (auto& [name, line] : posts_.lines()) {
       if (line.posts == 0) continue;
-      servers.push_back({name, line.posts, line.bytes, line.inFlight, line.failures,
-                         std::chrono::seconds(seconds() - oldest[&line]),
-                         std::max(Duration(0), line.inFlight == 0 ? line.nextTry - now : Duration(0))});
+      Server& server = servers.emplace_back(std::move(lines[&line]));
+      server.server = name;
+      server.posts = line.posts;
+      server.bytes = line.bytes;
+      server.inFlight = line.inFlight;
+      server.failures = line.failures;
+      server.lastStatus = line.lastStatus;
+      for (const auto& [number, aside] : line.aside) server.failingAlone += aside.strikes != 0 ? 1 : 0;
+      if (line.inFlight == 0) server.untilNextTry = std::max(Duration(0), line.nextTry - now);
     }
     return servers;
   });

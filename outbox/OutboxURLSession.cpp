@@ -106,6 +106,7 @@ class OutboxSessionState : public std::enable_shared_from_this<OutboxSessionStat
     failed.booked = post.request.events;
     failed.retryAfter = shared_->outbox->pauseBy(response);
     failed.isUnanswered = response == nullptr;
+    failed.status = response != nullptr ? response->status : 0;
     failed.mayHaveLeft = mayHaveLeft(reply.response, reply.error);
     shared_->outbox->keep(std::move(failed), [self = shared_from_this(), post = std::move(post),
                                               reply = std::move(reply)](bool isKept) mutable {

@@ -68,6 +68,8 @@ class PostStore {
   virtual void becameEmpty() = 0;
   // What is there is put beside, for a person to look at, and the next change begins anew. Its text: what was done.
   [[nodiscard]] virtual std::string setAside() = 0;
+  // What was put aside is gone, if there was any.
+  virtual void removeSetAside() = 0;
   virtual void close() = 0;
 };
 

@@ -35,7 +35,8 @@ void PostReply::operator()(std::optional<Data>, std::optional<URLResponse> respo
   tellOwner(response, error);
   const int status = response ? response->status : 0;
   standing.ended(static_cast<uint32_t>(platform.clock.timeOfDay().asSeconds()), status);
-  if (const auto posted = events.events(); posted != nullptr && posted->watchedPost() != nullptr)
+  if (const auto posted = events.events();
+      posted != nullptr && !posted->areKept() && posted->watchedPost() != nullptr)
     posted->watchedPost()->answered(status);
   const bool redirected = status >= 300 && status <= 399;
   const bool refused = status >= 400 && status <= 599;  // also by a reply that broke off

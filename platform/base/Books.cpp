@@ -296,17 +296,26 @@ void BookedEvents::drop(Counters& counters, Reason fate) const {
 }
 
 void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
+  PassedEvent fate;
+  fate.dropped = dropped;
+  if (dropped) fate.rule = shown_->rule;
+  if (shown_->post != nullptr && shown_->post->number() != 0) fate.post = shown_->post;
+  fate.isFirstOfPost = fate.post != nullptr;
+  tellWatchers(std::move(fate));
+}
+
+void BookedEvents::tellWatchers(PassedEvent fate) const {
   BookedEventsReader tallies(*this);
-  const bool isPosted = shown_->post != nullptr && shown_->post->number() != 0;
   for (size_t i = 0; i < size_; ++i) {
     const Tally* tally = tallies.next();
     const EventKind kind = i < shown_->kinds.size() ? shown_->kinds[i] : EventKind();
     if (tally == nullptr || !shown_->watchers->want(tally->program(), kind)) continue;
-    PassedEvent event = tally->passed(kind, dropped);
+    PassedEvent event = tally->passed(kind, fate.dropped);
     event.backEnd = shown_->backEnd;
-    if (dropped) event.rule = shown_->rule;
-    if (isPosted) event.post = shown_->post;
-    event.isFirstOfPost = isPosted && i == 0;
+    event.isKept = fate.isKept;
+    event.rule = fate.rule;
+    event.post = fate.post;
+    event.isFirstOfPost = fate.isFirstOfPost && i == 0;
     shown_->watchers->tell(std::move(event));
   }
 }
@@ -325,12 +334,35 @@ std::vector<BookedEvents::OfRow> BookedEvents::rows() const {
   return rows;
 }
 
-void BookedEvents::keep() const {
+void BookedEvents::keep(int status) const {
   forEachRun([](Tally& tally, size_t events) {
     tally.endPost(events);
     tally.enterOutbox(events);
   });
   areKept_ = true;
+  if (shown_ == nullptr) return;
+  PassedEvent fate;
+  fate.isKept = true;
+  if (shown_->post != nullptr && shown_->post->number() != 0) {
+    shown_->post->answered(status);
+    fate.post = shown_->post;
+  }
+  fate.isFirstOfPost = fate.post != nullptr;
+  tellWatchers(std::move(fate));
+}
+
+// What was answered never changes, so this is another post to the same server.
+void BookedEvents::tellEnd(std::optional<Reason> dropped, int status) const {
+  if (shown_ == nullptr) return;
+  PassedEvent fate;
+  fate.dropped = dropped;
+  if (status != 0 && shown_->post != nullptr) {
+    const auto repeat = std::make_shared<WatchedPost>(shown_->watchers);
+    repeat->leaves(shown_->post->server(), {});
+    repeat->answered(status);
+    fate.post = repeat;
+  }
+  tellWatchers(std::move(fate));
 }
 
 Tally* BookedEventsReader::next() {

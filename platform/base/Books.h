@@ -160,6 +160,7 @@ class BookedEvents {
   };
   // From now on whoever watches is told their fate. Only where anybody watches, and once they are complete.
   void show(Shown shown) { shown_ = std::make_shared<const Shown>(std::move(shown)); }
+  [[nodiscard]] bool areShown() const { return shown_ != nullptr; }
   // What carries them; null: they are not shown, or not posted.
   [[nodiscard]] WatchedPost* watchedPost() const { return shown_ != nullptr ? shown_->post.get() : nullptr; }
 
@@ -184,9 +185,11 @@ class BookedEvents {
     uint64_t events = 0;
   };
   [[nodiscard]] std::vector<OfRow> rows() const;
-  // The outbox has them: their post has ended, and whoever posted them (PostedEvents) closes nothing any more. By whoever
-  // answers the post, before the answer.
-  void keep() const;
+  // The outbox has them: their post has ended with that status (0: no answer came), and whoever posted them (PostedEvents)
+  // closes nothing any more. By whoever answers the post, before the answer.
+  void keep(int status) const;
+  // For watchers alone: what became at last of what was kept.
+  void tellEnd(std::optional<Reason> dropped, int status) const;
   [[nodiscard]] bool areKept() const { return areKept_; }
 
  private:
@@ -198,6 +201,7 @@ class BookedEvents {
   template <typename Operation>
   void forEachRun(Operation operation) const;
   void tellWatchers(std::optional<Reason> dropped) const;
+  void tellWatchers(PassedEvent fate) const;
 
   std::vector<Run> runs_;
   size_t size_ = 0;

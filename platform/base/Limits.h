@@ -105,6 +105,10 @@ struct Limits {
   static constexpr size_t maxOutboxPosts = 131072;
   static constexpr size_t maxBytesOnTheWayToTheOutbox = 8u << 20;
   static constexpr size_t maxOutboxBytesInFlight = 4u << 20;
+  // Requests of it at a time, to all servers: servers that are silent leave room for what is posted meanwhile.
+  static constexpr size_t maxOutboxRequestsInFlight = 64;
+  // Kept posts of which it knows the events' categories, for watchers: each is some KiB.
+  static constexpr size_t maxWatchedKeptPosts = 256;
 };
 
 }  // namespace kyt

@@ -56,13 +56,14 @@ class WatchedPost {
   int status_ = 0;
 };
 
-// One event, when it is known what became of it.
+// One event, when it is known what became of it, and before that when the outbox keeps it.
 struct PassedEvent {
   ReportingProgram program;  // its names cut as in the books
   std::string backEnd;
   bool isInternal = false;
   EventKind kind;
-  std::optional<Reason> dropped;  // none: delivered
+  std::optional<Reason> dropped;  // none: delivered, or kept
+  bool isKept = false;            // in the outbox: no end yet
   const char* rule = "";  // what made a back end drop it, a word with hyphens; empty: the reason says all
   int64_t seconds = 0;    // since 1970
   std::shared_ptr<const WatchedPost> post;  // null: no request carried it

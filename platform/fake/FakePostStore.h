@@ -15,9 +15,11 @@ class FakePostStore final : public PostStore {
  public:
   struct Disk {
     std::map<int64_t, StoredPost> posts;
-    std::optional<PostStoreProblem> problem;  // what every operation meets
+    std::optional<PostStoreProblem> problem;         // what every operation meets
+    std::optional<PostStoreProblem> problemForGood;  // after a change that is for good
     size_t changes = 0, setAside = 0;
     bool wasForGood = false;  // the last change
+    bool isSetAside = false;  // something lies beside
   };
   explicit FakePostStore(std::shared_ptr<Disk> disk) : disk_(std::move(disk)) {}
 
@@ -39,7 +41,7 @@ class FakePostStore final : public PostStore {
     for (const StoredPost* post : added) disk_->posts[post->number] = *post;
     ++disk_->changes;
     disk_->wasForGood = forGood;
-    return std::nullopt;
+    return forGood ? disk_->problemForGood : std::nullopt;
   }
   [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override {
     if (disk_->problem) return *disk_->problem;
@@ -50,10 +52,12 @@ class FakePostStore final : public PostStore {
   void becameEmpty() override {}
   [[nodiscard]] std::string setAside() override {
     ++disk_->setAside;
+    disk_->isSetAside = true;
     disk_->posts.clear();
     disk_->problem.reset();
     return "set aside";
   }
+  void removeSetAside() override { disk_->isSetAside = false; }
   void close() override {}
 
  private:

@@ -69,6 +69,11 @@ class OutboxFixture : public testing::Test {
       tally->take();
       booked.add(tally.get());
     }
+    if (isShown_) {
+      auto watched = std::make_shared<WatchedPost>(books_->watchers());
+      watched->leaves(kServer, body);
+      booked.show({books_->watchers(), "httppost", "", std::vector<EventKind>(events, {9, 1}), watched});
+    }
     auto posted = std::make_shared<PostedEvents>(std::move(booked), test_.counters);
     URLRequest request;
     request.method = "POST";
@@ -123,7 +128,7 @@ class OutboxFixture : public testing::Test {
 
   TestPlatform test_;
   OutboxSettings settings_{.enabled = true};
-  bool isByConsent_ = false;
+  bool isByConsent_ = false, isShown_ = false;
   const std::shared_ptr<FakePostStore::Disk> disk_ = std::make_shared<FakePostStore::Disk>();
   std::unique_ptr<Books> books_ = std::make_unique<Books>();
   std::unique_ptr<FakeURLSessionFactory> network_ = std::make_unique<FakeURLSessionFactory>();

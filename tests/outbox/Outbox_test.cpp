@@ -1,5 +1,7 @@
 #include "outbox/Outbox.h"
 
+#include <algorithm>
+
 #include "platform/base/Limits.h"
 #include "tests/outbox/OutboxFixture.h"
 
@@ -41,7 +43,122 @@ TEST_F(OutboxTest, SendsTheOldestFirstAndOneAtATimeUntilOneIsTakenThenFour) {
     if (network_->isOpen(i)) answer(i, 503);
   EXPECT_TRUE(openBodies().empty()) << "it waits again";
   pass(minutes(1));
-  EXPECT_EQ(openBodies(), std::vector<std::string>({"1"}));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"6"})) << "one of those that failed may be the reason";
+  answer(last(), 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"1", "2", "3", "5"}));
+}
+
+// "bad" is never taken, all others are.
+class OutboxWithABadPost : public OutboxTest {
+ protected:
+  void begin() {
+    start();
+    waitLong();
+    network_->setResponder([this](const URLRequest& request) {
+      FakeURLSessionFactory::Reply reply;
+      if (request.body.view() == "bad") {
+        ++sentBad_;
+        reply.status = badStatus_;
+        if (badStatus_ == 0) reply.error = Error{kKYTURLErrorDomain, 52, "closed without an answer"};
+      } else if (isDown_) {
+        reply.status = 503;
+      } else {
+        taken_.emplace_back(request.body.view());
+      }
+      return std::optional(std::move(reply));
+    });
+  }
+  int badStatus_ = 500;
+  bool isDown_ = true;
+  size_t sentBad_ = 0;
+  std::vector<std::string> taken_;
+};
+
+TEST_F(OutboxWithABadPost, HoldsNoOtherUp) {
+  for (const int status : {500, 0}) {
+    badStatus_ = status;
+    isDown_ = true;
+    taken_.clear();
+    sentBad_ = 0;
+    begin();
+    for (const char* body : {"a", "bad", "b", "c", "d", "e", "f", "g"}) static_cast<void>(post(body));
+    isDown_ = false;
+    pass(minutes(1));
+    EXPECT_EQ(taken_, std::vector<std::string>({"a", "b", "c", "d", "e", "f", "g"})) << status;
+    EXPECT_EQ(disk_->posts.size(), 1U);
+    pass(hours(24));
+    EXPECT_LE(sentBad_, 60U) << "half an hour between two tries";
+    EXPECT_EQ(outbox_->drop({}), 1U);
+    stop();
+  }
+}
+
+TEST_F(OutboxWithABadPost, HoldsNoOtherUpHoweverManyItsServerDoesNotTake) {
+  begin();
+  for (int i = 0; i < 20; ++i) static_cast<void>(post("bad"));
+  for (int i = 0; i < 20; ++i) static_cast<void>(post(std::to_string(i)));
+  isDown_ = false;
+  pass(hours(12));
+  ASSERT_EQ(taken_.size(), 20U);
+  EXPECT_TRUE(std::is_sorted(taken_.begin() + 1, taken_.end(), [](const auto& one, const auto& other) {
+    return std::stoi(one) < std::stoi(other);
+  }));
+  const size_t before = sentBad_;
+  static_cast<void>(post("kept a moment", 1000, std::string(kServer) + "/v1/late"));
+  pass(hours(24));
+  EXPECT_LE(sentBad_ - before, 20U * 60U);
+}
+
+TEST_F(OutboxWithABadPost, IsSentLessAndLessOftenToAServerThatTakesNewPosts) {
+  begin();
+  static_cast<void>(post("bad"));
+  isDown_ = false;
+  for (int second = 0; second < 7200; second += 2) {
+    static_cast<void>(post("new"));
+    pass(seconds(2));
+  }
+  EXPECT_LE(sentBad_, 20U);
+  EXPECT_GE(sentBad_, 8U);
+}
+
+TEST_F(OutboxWithABadPost, IsSentLessAndLessOftenToAServerThatTakesANewPostNowAndThen) {
+  begin();
+  static_cast<void>(post("bad"));
+  isDown_ = false;
+  for (int minute = 0; minute < 1440; ++minute) {
+    static_cast<void>(post("new"));
+    pass(minutes(1));
+  }
+  EXPECT_LE(sentBad_, 90U);
+}
+
+TEST_F(OutboxWithABadPost, LeavesTheOthersTheirOrderAfterAnOutage) {
+  begin();
+  std::vector<std::string> sorted;
+  for (int i = 0; i < 200; ++i) {
+    static_cast<void>(post(std::to_string(1000 + i)));
+    sorted.push_back(std::to_string(1000 + i));
+    pass(minutes(7));
+  }
+  isDown_ = false;
+  pass(hours(1));
+  ASSERT_EQ(taken_.size(), sorted.size());
+  sorted.erase(std::find(sorted.begin(), sorted.end(), taken_.front()));
+  EXPECT_EQ(std::vector<std::string>(taken_.begin() + 1, taken_.end()), sorted)
+      << "only the one that found the server well comes before its turn";
+}
+
+TEST_F(OutboxTest, LeavesRoomForNewPostsHoweverManyServersAreSilent) {
+  start();
+  constexpr size_t kServers = Limits::maxOutboxRequestsInFlight + 20;
+  for (size_t i = 0; i < kServers; ++i)
+    postAndKeep("x", 1000, "https://silent" + std::to_string(i) + ".example.org");
+  pass(seconds(6));
+  EXPECT_EQ(openBodies().size(), Limits::maxOutboxRequestsInFlight);
+  const size_t before = sent();
+  fail(last(), 28);
+  pass(seconds(0));
+  EXPECT_EQ(sent(), before + 1) << "the next one's turn";
 }
 
 TEST_F(OutboxTest, WaitsForARandomTimeUpToALimitThatDoublesUpToHalfAnHour) {
@@ -343,6 +460,68 @@ TEST_F(OutboxTest, SetsADamagedFileAsideAndGoesOn) {
   postAndKeep("kept");
   EXPECT_EQ(disk_->posts.size(), 1U);
   EXPECT_EQ(row().outbox, 2U);
+}
+
+TEST_F(OutboxTest, KeepsNoDamagedFileOfWhichPartsMayBeOfAConsentThatIsGone) {
+  start();
+  postAndKeep("lost");
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::damaged, "malformed"};
+  pass(seconds(5));
+  EXPECT_TRUE(disk_->isSetAside);
+  test_.consent.setAllowed(false);
+  postAndKeep("without consent");
+  EXPECT_FALSE(disk_->isSetAside);
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::damaged, "malformed"};
+  pass(seconds(6));
+  EXPECT_EQ(disk_->setAside, 2U);
+  EXPECT_FALSE(disk_->isSetAside);
+}
+
+TEST_F(OutboxTest, SaysOfNoPostThatItIsNotKeptBecauseAnotherCouldNotBeOverwritten) {
+  start();
+  isByConsent_ = true;
+  postAndKeep("by consent");
+  isByConsent_ = false;
+  const auto outcome = post("without");
+  test_.consent.setAllowed(false);
+  disk_->problemForGood = PostStoreProblem{PostStoreProblem::Kind::unavailable, "cannot cut its log short"};
+  answer(last(), 503);
+  EXPECT_EQ(outcome->response.has_value(), disk_->posts.empty());
+  EXPECT_EQ(row().outbox, disk_->posts.size() * 2);
+}
+
+std::vector<std::string> fatesOf(Watcher& watcher) {
+  std::vector<std::string> fates;
+  while (const auto event = watcher.next()) {
+    std::string fate = event->dropped ? reasonName(*event->dropped) : event->isKept ? "kept" : "delivered";
+    fate += " " + std::to_string(event->kind.category) + " " + event->backEnd;
+    if (event->post) fate += " " + event->post->server() + " " + std::to_string(event->post->status());
+    fates.push_back(std::move(fate));
+  }
+  return fates;
+}
+
+TEST_F(OutboxTest, ShowsWatchersThatAPostIsKeptAndItsEnd) {
+  start();
+  const auto watcher = books_->watchers()->watch({});
+  isShown_ = true;
+  static_cast<void>(post("body"));
+  answer(last(), 503);
+  const std::string kept = "kept 9 httppost https://events.example.org 503";
+  EXPECT_EQ(fatesOf(*watcher), std::vector<std::string>({kept, kept}));
+  pass(seconds(6));
+  answer(last(), 200);
+  const std::string end = "delivered 9 httppost https://events.example.org 200";
+  EXPECT_EQ(fatesOf(*watcher), std::vector<std::string>({end, end}));
+}
+
+TEST_F(OutboxTest, ShowsWatchersTheEndOfWhatWasKeptBeforeTheyCame) {
+  start();
+  postAndKeep("body");
+  const auto watcher = books_->watchers()->watch({});
+  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_EQ(fatesOf(*watcher),
+            std::vector<std::string>({"outbox-dropped -1 httppost", "outbox-dropped -1 httppost"}));
 }
 
 TEST_F(OutboxTest, LosesOnlyThePostThatCannotBeRead) {

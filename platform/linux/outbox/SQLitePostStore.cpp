@@ -18,6 +18,7 @@ namespace {
 using Kind = PostStoreProblem::Kind;
 
 constexpr mode_t kMode = 0600;
+constexpr char kAside[] = ".damaged";
 constexpr off_t kWorthGivingBack = 1 << 20;  // bytes
 
 // Small pages, since each that holds a byte of a post is written twice, to the log and to the file.
@@ -231,9 +232,13 @@ void SQLitePostStore::becameEmpty() {
   static_cast<void>(::unlink((file_ + "-wal").c_str()));
 }
 
+void SQLitePostStore::removeSetAside() {
+  static_cast<void>(::unlink((file_ + kAside).c_str()));
+}
+
 std::string SQLitePostStore::setAside() {
   close();
-  const std::string aside = file_ + ".damaged";
+  const std::string aside = file_ + kAside;
   static_cast<void>(::unlink((file_ + "-wal").c_str()));
   if (std::rename(file_.c_str(), aside.c_str()) == 0) return "it is " + aside + " now";
   const std::string why = errorText(errno);

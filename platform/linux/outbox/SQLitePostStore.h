@@ -32,6 +32,7 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override;
   void becameEmpty() override;
   [[nodiscard]] std::string setAside() override;
+  void removeSetAside() override;
   void close() override;
 
   [[nodiscard]] const std::string& file() const { return file_; }

@@ -112,7 +112,7 @@ TEST_F(BooksTest, BookAPostThatNobodyAnswersAsCutOff) {
 TEST_F(BooksTest, KnowWhatTheOutboxKeepsUntilItIsDeliveredOrLost) {
   open();
   PostedEvents posted(taken(5), counters_);
-  posted.events()->keep();
+  posted.events()->keep(0);
   EXPECT_EQ(row().outbox, 5U);
   EXPECT_EQ(row().inFlight, 0U);
   EXPECT_EQ(row().pending(), 5U);
@@ -131,7 +131,7 @@ TEST_F(BooksTest, LetNobodyCloseAPostThatTheOutboxHas) {
   open();
   for (int end = 0; end < 3; ++end) {
     PostedEvents posted(taken(1), counters_);
-    posted.events()->keep();
+    posted.events()->keep(0);
     if (end == 0) posted.delivered();
     if (end == 1) posted.dropped(Reason::postFailed);
   }
