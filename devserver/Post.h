@@ -34,7 +34,9 @@ struct Post {
   unsigned answered = 0;  // the HTTP status; 0: the connection was closed without an answer
   std::string clientId;
   std::optional<double> postTime;
-  uint64_t textSize = 0;  // of the body after decompression
+  uint64_t textSize = 0;           // of the body after decompression
+  std::string sha256;              // of the body as sent, in hexadecimal digits
+  std::optional<int64_t> repeats;  // the first post that is kept with the same body; none: this is it
   std::vector<Event> events;
 };
 

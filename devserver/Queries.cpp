@@ -158,10 +158,10 @@ Reply Queries::post(int64_t id) {
     if (!row.step()) return missing("no such post");
     JsonText out;
     postMembers(out.object(), row);
-    out.key("headers").json(row.text(17));
+    out.key("headers").json(row.text(19));
     std::string reason;
-    const std::string_view sent = row.text(18);
-    const std::optional<std::string> text = checker_.textOf(headersFromRow(row.text(17)), sent, reason);
+    const std::string_view sent = row.text(20);
+    const std::optional<std::string> text = checker_.textOf(headersFromRow(row.text(19)), sent, reason);
     const std::string_view shown = text ? std::string_view(*text) : sent;
     out.member("bodyIsText", isValidUTF8(shown)).member("body", shown);
     const std::optional<std::string> compact = rewriteJson(shown, false);

@@ -25,6 +25,8 @@ void postMembers(JsonText& out, const Statement& row) {
   out.member("clientId", row.text(12));
   optionalReal(out, "postTime", row, 13);
   out.member("size", row.integer(14)).member("textSize", row.integer(15)).member("events", row.integer(16));
+  out.member("sha256", row.text(17));
+  optionalNumber(out, "repeats", row, 18);
 }
 
 void postMembers(JsonText& out, const Post& post) {
@@ -34,6 +36,7 @@ void postMembers(JsonText& out, const Post& post) {
   out.member("reason", post.reason).member("digest", post.digest).member("answered", post.answered);
   out.member("clientId", post.clientId).member("postTime", post.postTime).member("size", post.body.size());
   out.member("textSize", post.textSize).member("events", post.events.size());
+  out.member("sha256", post.sha256).member("repeats", post.repeats);
 }
 
 void eventObject(JsonText& out, const Event& event, const Post& post) {

@@ -15,7 +15,7 @@ namespace kyt::devserver {
 inline constexpr char kPostColumns[] =
     "id, received, secure, http_method, path, client, service, sender, good, reason, digest, answered, "
     "client_id, "
-    "post_time, size, text_size, events";
+    "post_time, size, text_size, events, sha256, repeats";
 
 // A member that is null where the column is.
 void optionalNumber(JsonText& out, const char* name, const Statement& row, int column);

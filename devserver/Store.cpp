@@ -1,9 +1,11 @@
 #include "devserver/Store.h"
 
+#include <openssl/sha.h>
 #include <pthread.h>
 #include <sys/stat.h>
 
 #include "devserver/JsonText.h"
+#include "platform/base/Hex.h"
 
 namespace kyt::devserver {
 namespace {
@@ -19,7 +21,7 @@ PRAGMA foreign_keys = ON;
 CREATE TABLE IF NOT EXISTS posts (
   id INTEGER PRIMARY KEY AUTOINCREMENT, received REAL, secure INTEGER, http_method TEXT, path TEXT, client TEXT,
   service TEXT, sender TEXT, good INTEGER, reason TEXT, digest TEXT, answered INTEGER, client_id TEXT, post_time REAL,
-  text_size INTEGER, events INTEGER, headers TEXT, size INTEGER, body BLOB);
+  text_size INTEGER, events INTEGER, headers TEXT, size INTEGER, body BLOB, sha256 TEXT, repeats INTEGER);
 CREATE TABLE IF NOT EXISTS events (
   id INTEGER PRIMARY KEY AUTOINCREMENT, post INTEGER REFERENCES posts(id) ON DELETE CASCADE, received REAL,
   client TEXT, service TEXT, sender TEXT, method INTEGER, status INTEGER, session TEXT, number INTEGER, time REAL,
@@ -36,6 +38,18 @@ CREATE TABLE IF NOT EXISTS arrivals (
   id INTEGER PRIMARY KEY AUTOINCREMENT, kind INTEGER, received REAL, good INTEGER, json TEXT);
 CREATE INDEX IF NOT EXISTS arrivals_kind ON arrivals(kind, id);
 )sql";
+// A database of before has no such columns yet.
+constexpr char kAddBodyNames[] =
+    "ALTER TABLE posts ADD COLUMN sha256 TEXT; ALTER TABLE posts ADD COLUMN repeats INTEGER";
+constexpr char kIndexBodyNames[] = "CREATE INDEX IF NOT EXISTS posts_sha256 ON posts(sha256)";
+
+std::string sha256Of(std::string_view bytes) {
+  unsigned char digest[SHA256_DIGEST_LENGTH];
+  SHA256(reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(), digest);
+  std::string text;
+  appendHex(std::string_view(reinterpret_cast<const char*>(digest), sizeof digest), text);
+  return text;
+}
 
 std::string headersAsJson(const std::vector<Header>& headers) {
   JsonText json;
@@ -57,7 +71,10 @@ uint64_t keptSizeOf(const Post& post) {
 }  // namespace
 
 bool Store::makeTables(Database& database) {
-  return database.execute(kTables);
+  if (!database.execute(kTables)) return false;
+  const bool isOld =
+      database.number("SELECT count(*) FROM pragma_table_info('posts') WHERE name = 'sha256'") == 0;
+  return (!isOld || database.execute(kAddBodyNames)) && database.execute(kIndexBodyNames);
 }
 
 std::unique_ptr<Store> Store::open(const std::filesystem::path& file, Retention retention,
@@ -80,10 +97,11 @@ Store::Store(std::unique_ptr<Database> writer, std::unique_ptr<Database> reader,
     : retention_(retention),
       committed_(std::move(committed)),
       writer_(std::move(writer)),
-      insertPost_(writer_->prepare("INSERT INTO posts VALUES(NULL,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)")),
+      insertPost_(writer_->prepare("INSERT INTO posts VALUES(NULL,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)")),
       insertEvent_(writer_->prepare("INSERT INTO events VALUES(NULL,?,?,?,?,?,?,?,?,?,?,?)")),
       insertFetch_(writer_->prepare("INSERT INTO fetches VALUES(NULL,?,?,?,?,?,?,?,?,?)")),
       insertArrival_(writer_->prepare("INSERT INTO arrivals VALUES(NULL,?,?,?,?)")),
+      firstOfBody_(writer_->prepare("SELECT min(id) FROM posts WHERE sha256 = ?")),
       reader_(std::move(reader)) {
   writtenTotals_ = {writer_->number("SELECT count(*) FROM posts"),
                     writer_->number("SELECT count(*) FROM posts WHERE NOT good"),
@@ -194,7 +212,17 @@ void Store::write(Pending& pending) {
   if (!writer_->execute("COMMIT")) writer_->execute("ROLLBACK");
 }
 
+// A device sends a post again byte for byte: its body names it.
+void Store::nameBody(Post& post) {
+  if (post.body.empty()) return;
+  post.sha256 = sha256Of(post.body);
+  firstOfBody_.bind(post.sha256);
+  if (firstOfBody_.step() && !firstOfBody_.isNull(0)) post.repeats = firstOfBody_.integer(0);
+  firstOfBody_.reset();
+}
+
 void Store::writePost(Post& post) {
+  nameBody(post);
   insertPost_.bind(post.received).bind(int64_t{post.secure}).bind(post.method).bind(post.path);
   insertPost_.bind(post.client)
       .bind(post.service)
@@ -205,7 +233,9 @@ void Store::writePost(Post& post) {
   insertPost_.bind(static_cast<int64_t>(post.textSize)).bind(static_cast<int64_t>(post.events.size()));
   insertPost_.bind(headersAsJson(post.headers))
       .bind(static_cast<int64_t>(post.body.size()))
-      .bindBlob(post.body);
+      .bindBlob(post.body)
+      .bind(post.sha256)
+      .bind(post.repeats);
   if (!insertPost_.run()) return;
   post.id = writer_->lastInsertedRow();
   for (const Event& event : post.events) {

@@ -78,6 +78,7 @@ class Store {
   void drain() EXCLUDES(mutex_);
   void writeLoop() EXCLUDES(mutex_);
   void write(Pending& pending);
+  void nameBody(Post& post);
   void writePost(Post& post);
   void writeFetch(Fetch& fetch);
   void writeArrival(Arrival& arrival);
@@ -88,7 +89,7 @@ class Store {
   const std::function<void(const Commit&)> committed_;
   // The writer's thread alone.
   std::unique_ptr<Database> writer_;
-  Statement insertPost_, insertEvent_, insertFetch_, insertArrival_;
+  Statement insertPost_, insertEvent_, insertFetch_, insertArrival_, firstOfBody_;
   uint64_t keptPosts_ = 0, keptBytes_ = 0;
   Totals writtenTotals_;
 

@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 #include <openssl/evp.h>
 #include <openssl/hmac.h>
+#include <openssl/sha.h>
+#include <sqlite3.h>
 
 #include <cstdio>
 
@@ -29,6 +31,18 @@ std::string digestOf(const std::string& key, const std::string& body) {
   return {text, at};
 }
 
+std::string sha256(const std::string& bytes) {
+  unsigned char digest[SHA256_DIGEST_LENGTH];
+  SHA256(reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(), digest);
+  std::string text;
+  for (const unsigned char byte : digest) {
+    char digits[3];
+    std::snprintf(digits, sizeof digits, "%02x", byte);
+    text += digits;
+  }
+  return text;
+}
+
 class PostsTest : public testing::Test {
  protected:
   void start(std::vector<std::string> options = {}) {
@@ -50,6 +64,19 @@ class PostsTest : public testing::Test {
     EXPECT_EQ(post["answered"].GetInt(), status);
     EXPECT_NE(std::string(post["reason"].GetString()).find(reason), std::string::npos)
         << post["reason"].GetString();
+  }
+
+  // As a server of before left its database.
+  void removeNamesOfBodies() const {
+    sqlite3* database = nullptr;
+    ASSERT_EQ(sqlite3_open((state_.path() / "devserver.sqlite").c_str(), &database), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(database,
+                           "DROP INDEX posts_sha256; ALTER TABLE posts DROP COLUMN repeats;"
+                           "ALTER TABLE posts DROP COLUMN sha256",
+                           nullptr, nullptr, nullptr),
+              SQLITE_OK)
+        << sqlite3_errmsg(database);
+    sqlite3_close(database);
   }
 
   TemporaryFolder state_;
@@ -225,6 +252,41 @@ TEST_F(PostsTest, SurviveARestart) {
   start();
   EXPECT_EQ(server_->get("/api/totals")["events"].GetInt(), 1);
   EXPECT_EQ(newest()["body"].GetString(), message(kRecord));
+}
+
+TEST_F(PostsTest, ABodyThatCameBeforeIsShownAsARepeatOfTheFirst) {
+  start();
+  const std::string sent = gzip(message(kRecord));
+  EXPECT_EQ(server_->post("/events", sent, {"Content-Encoding: gzip"}).status, 200);
+  const auto first = newest();
+  EXPECT_TRUE(first["repeats"].IsNull());
+  EXPECT_EQ(std::string(first["sha256"].GetString()), sha256(sent));
+  EXPECT_EQ(server_->post("/events", message(kRecord)).status, 200);
+  EXPECT_TRUE(newest()["repeats"].IsNull()) << "other bytes";
+  EXPECT_EQ(server_->stop(), 0) << server_->errors();
+  start();
+  for (int i = 0; i < 2; ++i) {
+    EXPECT_EQ(server_->post("/events", sent, {"Content-Encoding: gzip"}).status, 200);
+    const auto repeat = newest();
+    EXPECT_GT(repeat["id"].GetInt64(), first["id"].GetInt64());
+    EXPECT_EQ(repeat["repeats"].GetInt64(), first["id"].GetInt64());
+  }
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(server_->post("/events", "").status, 400);
+  EXPECT_TRUE(newest()["repeats"].IsNull()) << "an empty body names nothing";
+}
+
+TEST_F(PostsTest, ADatabaseWithoutNamesOfBodiesIsTakenOver) {
+  start();
+  EXPECT_EQ(server_->post("/events", message(kRecord)).status, 200);
+  EXPECT_EQ(server_->stop(), 0) << server_->errors();
+  removeNamesOfBodies();
+  start();
+  EXPECT_TRUE(newest()["repeats"].IsNull());
+  EXPECT_EQ(server_->post("/events", message(kRecord)).status, 200);
+  const auto second = newest();
+  EXPECT_TRUE(second["repeats"].IsNull()) << "of the first nobody knows";
+  EXPECT_EQ(server_->post("/events", message(kRecord)).status, 200);
+  EXPECT_EQ(newest()["repeats"].GetInt64(), second["id"].GetInt64());
 }
 
 TEST_F(PostsTest, TheOldestGoWhenThereAreMoreThanAreToBeKept) {
