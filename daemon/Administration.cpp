@@ -15,6 +15,8 @@ namespace kyt {
 
 namespace {
 
+constexpr char kOutboxIsOff[] = "There is no outbox: outbox.enabled in kytreportingd.toml is not set";
+
 std::string refusalOf(const AdministrationAccess& access) {
   std::string text = "Only root, the daemon's own user";
   text += access.group ? " and members of the group " + access.groupName : std::string();
@@ -26,8 +28,8 @@ std::string refusalOf(const AdministrationAccess& access) {
 // One connection's.
 class Administration::Window final : public AdministrationInterface {
  public:
-  Window(const Administration& all, bool mayLook, bool maySeeBodies, std::shared_ptr<SerialQueue> queue)
-      : all_(all), mayLook_(mayLook), maySeeBodies_(maySeeBodies), queue_(std::move(queue)) {}
+  Window(const Administration& all, bool mayLook, bool ownsDaemon, std::shared_ptr<SerialQueue> queue)
+      : all_(all), mayLook_(mayLook), ownsDaemon_(ownsDaemon), queue_(std::move(queue)) {}
   [[nodiscard]] const char* refusal() const override { return mayLook_ ? nullptr : all_.refusal_.c_str(); }
   [[nodiscard]] Dictionary status() override { return all_.status(); }
   [[nodiscard]] std::vector<Dictionary> sessions() override { return all_.sessions(); }
@@ -43,11 +45,18 @@ class Administration::Window final : public AdministrationInterface {
   [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) override {
     return all_.reload(lines);
   }
-  [[nodiscard]] std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) override;
+  [[nodiscard]] std::optional<AdministrationRefusal> watch(const Dictionary& filter,
+                                                           PassedSignal signal) override;
+  [[nodiscard]] std::vector<Dictionary> outbox() override {
+    return all_.hasOutbox() ? all_.outbox().view() : std::vector<Dictionary>();
+  }
+  [[nodiscard]] std::optional<AdministrationRefusal> flushOutbox() override;
+  [[nodiscard]] std::optional<AdministrationRefusal> dropOutbox(const Dictionary& filter,
+                                                                uint64_t& dropped) override;
 
  private:
   const Administration& all_;
-  const bool mayLook_, maySeeBodies_;
+  const bool mayLook_, ownsDaemon_;
   const std::shared_ptr<SerialQueue> queue_;  // the connection's
   std::shared_ptr<Watching> watching_;
 };
@@ -91,20 +100,44 @@ class Administration::Watching {
   TimerHandle timer_;
 };
 
-std::optional<WatchRefusal> Administration::Window::watch(const Dictionary& filter, PassedSignal signal) {
+std::optional<AdministrationRefusal> Administration::Window::watch(const Dictionary& filter,
+                                                                   PassedSignal signal) {
   WatchFilter wanted;
   if (const char* problem = readWatchFilter(filter, wanted))
-    return WatchRefusal{WatchRefusal::Why::wrongFilter, problem};
-  if (wanted.bodies && !maySeeBodies_)
-    return WatchRefusal{WatchRefusal::Why::notAllowed,
-                        "Only root and the daemon's own user may see what is in events"};
+    return AdministrationRefusal{AdministrationRefusal::Why::wrongFilter, problem};
+  if (wanted.bodies && !ownsDaemon_)
+    return AdministrationRefusal{AdministrationRefusal::Why::notAllowed,
+                                 "Only root and the daemon's own user may see what is in events"};
   watching_.reset();
   std::unique_ptr<Watcher> watcher = all_.watch(std::move(wanted));
   if (watcher == nullptr)
-    return WatchRefusal{WatchRefusal::Why::tooMany,
-                        std::to_string(Limits::maxWatchers) + " watch already: no more can"};
+    return AdministrationRefusal{AdministrationRefusal::Why::tooMany,
+                                 std::to_string(Limits::maxWatchers) + " watch already: no more can"};
   watching_ = std::make_shared<Watching>(std::move(watcher), std::move(signal));
   Watching::start(watching_, all_.sources_.platform.timers, queue_);
+  return std::nullopt;
+}
+
+std::optional<AdministrationRefusal> Administration::Window::flushOutbox() {
+  if (!all_.hasOutbox()) return AdministrationRefusal{AdministrationRefusal::Why::isOff, kOutboxIsOff};
+  all_.sources_.platform.log.normal("administration: The outbox is asked to send now");
+  all_.outbox().flush();
+  return std::nullopt;
+}
+
+// Who may look can delete nothing.
+std::optional<AdministrationRefusal> Administration::Window::dropOutbox(const Dictionary& filter,
+                                                                        uint64_t& dropped) {
+  if (!ownsDaemon_)
+    return AdministrationRefusal{AdministrationRefusal::Why::notAllowed,
+                                 "Only root and the daemon's own user may drop what the outbox keeps"};
+  OutboxFilter wanted;
+  if (const char* problem = readOutboxFilter(filter, wanted))
+    return AdministrationRefusal{AdministrationRefusal::Why::wrongFilter, problem};
+  if (!all_.hasOutbox()) return AdministrationRefusal{AdministrationRefusal::Why::isOff, kOutboxIsOff};
+  dropped = all_.outbox().drop(std::move(wanted.server), wanted.user);
+  all_.sources_.platform.log.normal("administration: %llu posts of the outbox are dropped",
+                                    static_cast<unsigned long long>(dropped));
   return std::nullopt;
 }
 

@@ -33,15 +33,22 @@ struct ProcessFigures {
   uint32_t threads = 0;
 };
 
+// All empty where the settings want no outbox. They may wait for the disk.
+struct OutboxOperations {
+  std::function<std::vector<Dictionary>()> view;
+  std::function<void()> flush;
+  std::function<uint64_t(std::optional<std::string> server, std::optional<uint32_t> user)> drop;
+};
+
 struct AdministrationSources {
   Platform& platform;
   const SessionStandings& sessions;
   const StorebagStandings& storebags;
   const ServerRecords& servers;
   std::string version;
-  int64_t since = 0;       // seconds since 1970
-  bool hasOutbox = false;  // the settings want one
+  int64_t since = 0;  // seconds since 1970
   // Any thread.
+  OutboxOperations outbox;
   std::function<size_t()> connections;
   std::function<ProcessFigures()> process;
   // The program that a process runs, empty where that cannot be known; may take seconds once, when nobody answers.
@@ -73,6 +80,8 @@ class Administration final : public ListenerDelegate {
   [[nodiscard]] std::optional<Dictionary> storebag(std::string_view name) const;
   [[nodiscard]] std::string metrics() const;
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
+  [[nodiscard]] bool hasOutbox() const { return sources_.outbox.view != nullptr; }
+  [[nodiscard]] const OutboxOperations& outbox() const { return sources_.outbox; }
   // Begins to watch; null where the limit of watchers is reached.
   [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter) const;
   [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) const {

@@ -192,7 +192,7 @@ Dictionary Administration::status() const {
                     {"now", secondsNow(platform)},
                     {"since", sources_.since},
                     {"logLevel", logLevelName(platform.log)},
-                    {"outbox", sources_.hasOutbox},
+                    {"outbox", hasOutbox()},
                     {"connections", static_cast<uint64_t>(sources_.connections())},
                     {"threads", process.threads},
                     {"memoryBytes", process.residentBytes},

@@ -23,7 +23,8 @@ WorkerPoolOptions workersOfOutbox() {
 }  // namespace
 
 DaemonOutbox::DaemonOutbox(Ports ports)
-    : workers_(workersOfOutbox()),
+    : clock_(ports.clock),
+      workers_(workersOfOutbox()),
       store_(std::move(ports.folder)),
       outbox_(
           Outbox::create({ports.clock, ports.timers, ports.random, workers_, ports.consent, ports.counters,
@@ -32,6 +33,30 @@ DaemonOutbox::DaemonOutbox(Ports ports)
       sessions_(ports.network, outbox_, workers_) {}
 
 DaemonOutbox::~DaemonOutbox() = default;
+
+std::vector<Dictionary> DaemonOutbox::view() const {
+  using std::chrono::duration_cast;
+  using std::chrono::seconds;
+  const int64_t now = clock_.timeOfDay().seconds;
+  std::vector<Dictionary> views;
+  for (const Outbox::Server& server : outbox_->list()) {
+    Array users;
+    for (const auto& [user, share] : server.users)
+      users.append(Dictionary{{"user", user}, {"posts", share.posts}, {"bytes", share.bytes}});
+    const int64_t wait = duration_cast<seconds>(server.untilNextTry + std::chrono::milliseconds(999)).count();
+    views.push_back(Dictionary{{"server", server.server},
+                               {"posts", server.posts},
+                               {"bytes", server.bytes},
+                               {"inFlight", server.inFlight},
+                               {"failures", uint64_t{server.failures}},
+                               {"failingAlone", server.failingAlone},
+                               {"lastStatus", static_cast<int64_t>(server.lastStatus)},
+                               {"oldest", now - duration_cast<seconds>(server.oldest).count()},
+                               {"nextTry", wait > 0 ? now + wait : int64_t{0}},
+                               {"users", std::move(users)}});
+  }
+  return views;
+}
 
 bool DaemonOutbox::shutDownWithin(Duration patience) {
   const bool finished = outbox_->finishWithin(patience);

@@ -4,6 +4,7 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "outbox/Outbox.h"
 #include "outbox/OutboxURLSession.h"
@@ -34,11 +35,14 @@ class DaemonOutbox {
 
   [[nodiscard]] URLSessionFactory& sessions() { return sessions_; }
   [[nodiscard]] Outbox& outbox() { return *outbox_; }
+  // For administrators, by the description of their interface: a line for each server.
+  [[nodiscard]] std::vector<Dictionary> view() const;
   // After the URL sessions have ended: keeps what is left, and ends the threads. False when the disk takes longer: then the
   // process must end without destroying this.
   [[nodiscard]] bool shutDownWithin(Duration patience);
 
  private:
+  Clock& clock_;
   WorkerPool workers_;
   SQLitePostStore store_;
   const std::shared_ptr<Outbox> outbox_;

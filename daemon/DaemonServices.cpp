@@ -109,7 +109,7 @@ AdministrationSources DaemonServices::administrationSources(std::string version,
           .servers = system_.servers,
           .version = std::move(version),
           .since = system_.clock.timeOfDay().seconds,
-          .hasOutbox = system_.outbox != nullptr,
+          .outbox = outboxOperations(),
           .connections = [this] { return listener_.connectionCount(); },
           .process =
               [] {
@@ -122,6 +122,17 @@ AdministrationSources DaemonServices::administrationSources(std::string version,
                 DaemonReload::Outcome outcome = reload_.reload();
                 lines = std::move(outcome.lines);
                 return std::move(outcome.problem);
+              }};
+}
+
+OutboxOperations DaemonServices::outboxOperations() {
+  if (!system_.outbox) return {};
+  Outbox& outbox = system_.outbox->outbox();
+  return {.view = [this] { return system_.outbox->view(); },
+          .flush = [&outbox] { outbox.flush(); },
+          .drop =
+              [&outbox](std::optional<std::string> server, std::optional<uint32_t> user) {
+                return outbox.drop({.server = std::move(server), .user = user});
               }};
 }
 

@@ -77,6 +77,7 @@ class DaemonServices {
   void endSessions(const Deadline& deadline);
   void waitForRequests(const Deadline& deadline);
   void logFigures();
+  [[nodiscard]] OutboxOperations outboxOperations();
   [[nodiscard]] AdministrationSources administrationSources(std::string version, ProgramInspector& inspector);
   [[nodiscard]] DBusServerServices serverServices();
 

@@ -46,6 +46,24 @@ const char* readWatchFilter(const Dictionary& wanted, WatchFilter& filter) {
   return nullptr;
 }
 
+const char* readOutboxFilter(const Dictionary& wanted, OutboxFilter& filter) {
+  for (const auto& entry : wanted) {
+    const std::string_view key = entry.key.view();
+    const Value& value = entry.value;
+    if (key == "server") {
+      if (value.string() == nullptr) return "\"server\" must be a text";
+      filter.server = value.string()->str();
+    } else if (key == "user") {
+      if (!isNumberUpTo(value, std::numeric_limits<uint32_t>::max()))
+        return "\"user\" must be a user's number";
+      filter.user = static_cast<uint32_t>(value.longLongValue());
+    } else {
+      return "the filter's keys are \"server\" and \"user\"";
+    }
+  }
+  return nullptr;
+}
+
 Dictionary passedView(const PassedEvent& event, bool bodies) {
   Dictionary view{{"time", event.seconds},
                   {"user", event.program.user},

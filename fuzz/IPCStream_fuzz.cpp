@@ -67,8 +67,14 @@ class EmptyWindow final : public AdministrationInterface {
   std::string metrics() override { return "# EOF\n"; }
   std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
   std::optional<std::string> reload(std::vector<std::string>& /*lines*/) override { return std::nullopt; }
-  std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) override {
-    if (filter.empty()) return WatchRefusal{WatchRefusal::Why::tooMany, "too many"};
+  std::vector<Dictionary> outbox() override { return {{{"server", "https://example.org"}}}; }
+  std::optional<AdministrationRefusal> flushOutbox() override { return std::nullopt; }
+  std::optional<AdministrationRefusal> dropOutbox(const Dictionary& filter, uint64_t& dropped) override {
+    dropped = filter.size();
+    return std::nullopt;
+  }
+  std::optional<AdministrationRefusal> watch(const Dictionary& filter, PassedSignal signal) override {
+    if (filter.empty()) return AdministrationRefusal{AdministrationRefusal::Why::tooMany, "too many"};
     static_cast<void>(signal(filter));
     return std::nullopt;
   }

@@ -75,13 +75,15 @@ PassedSignal passedSignal(const std::shared_ptr<ConnectionOutput>& output) {
   };
 }
 
-std::string_view errorName(WatchRefusal::Why why) {
+std::string_view errorName(AdministrationRefusal::Why why) {
   switch (why) {
-    case WatchRefusal::Why::tooMany:
+    case AdministrationRefusal::Why::tooMany:
       return wire::kErrorLimitsExceeded;
-    case WatchRefusal::Why::notAllowed:
+    case AdministrationRefusal::Why::notAllowed:
       return wire::kErrorAccessDenied;
-    case WatchRefusal::Why::wrongFilter:
+    case AdministrationRefusal::Why::isOff:
+      return wire::kErrorFailed;
+    case AdministrationRefusal::Why::wrongFilter:
       break;
   }
   return wire::kErrorInvalidArgs;
@@ -107,6 +109,25 @@ void storebag(const Call& call, std::string_view signature) {
     call.reply.error(wire::kErrorFailed, "no storebag of that name is in force");
 }
 
+void flushOutbox(const Call& call, std::string_view /*signature*/) {
+  if (call.in.finish() != BodyStatus::ok) return;
+  if (const auto refusal = call.window.flushOutbox())
+    call.reply.error(errorName(refusal->why), refusal->text);
+  else
+    call.reply.answerNothing();
+}
+
+void dropOutbox(const Call& call, std::string_view signature) {
+  Dictionary filter;
+  call.in.readDictionary(filter);
+  if (call.in.finish() != BodyStatus::ok) return;
+  uint64_t dropped = 0;
+  if (const auto refusal = call.window.dropOutbox(filter, dropped))
+    call.reply.error(errorName(refusal->why), refusal->text);
+  else
+    call.reply.answer(signature, [&](MessageWriter& out) { out.writeUInt64(dropped); });
+}
+
 // Each at the place of its row in kAdministrationMethods.
 constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     status,
@@ -118,6 +139,9 @@ constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
     reload,
     watch,
     storebag,
+    dictionaries<&AdministrationInterface::outbox>,
+    flushOutbox,
+    dropOutbox,
 };
 
 size_t numberOf(std::string_view member) {

@@ -25,7 +25,8 @@ inline constexpr std::array kAdministrationMethods{
     AdministrationContract{"Books", "", "aa{sv}"},    AdministrationContract{"Storebags", "", "aa{sv}"},
     AdministrationContract{"Metrics", "", "s"},       AdministrationContract{"SetLogLevel", "s", ""},
     AdministrationContract{"Reload", "", "as"},       AdministrationContract{"Watch", "a{sv}", ""},
-    AdministrationContract{"Storebag", "s", "a{sv}"},
+    AdministrationContract{"Storebag", "s", "a{sv}"}, AdministrationContract{"Outbox", "", "aa{sv}"},
+    AdministrationContract{"FlushOutbox", "", ""},    AdministrationContract{"DropOutbox", "a{sv}", "t"},
 };
 inline constexpr std::string_view kPassedSignal = "Passed", kPassedSignature = "a{sv}";
 

@@ -21,8 +21,8 @@ namespace kyt {
 // Sends the signal Passed. False: not now, since the peer has not read what was sent before.
 using PassedSignal = Function<bool(const Dictionary& passed)>;
 
-struct WatchRefusal {
-  enum class Why : uint8_t { wrongFilter, tooMany, notAllowed };
+struct AdministrationRefusal {
+  enum class Why : uint8_t { wrongFilter, tooMany, notAllowed, isOff };
   Why why = Why::wrongFilter;
   std::string text;
 };
@@ -43,7 +43,14 @@ class AdministrationInterface : public ExportedObject {
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;
   // From now on the peer is told of events as they pass, by the signal, on the connection's queue, until its end. Another call
   // puts another filter in place of the first. Why not, or none.
-  [[nodiscard]] virtual std::optional<WatchRefusal> watch(const Dictionary& filter, PassedSignal signal) = 0;
+  [[nodiscard]] virtual std::optional<AdministrationRefusal> watch(const Dictionary& filter,
+                                                                   PassedSignal signal) = 0;
+  // What could not be sent, a line for each server; empty without an outbox. These three may wait for the disk.
+  [[nodiscard]] virtual std::vector<Dictionary> outbox() = 0;
+  // Why not, or none. `dropped`: how many posts.
+  [[nodiscard]] virtual std::optional<AdministrationRefusal> flushOutbox() = 0;
+  [[nodiscard]] virtual std::optional<AdministrationRefusal> dropOutbox(const Dictionary& filter,
+                                                                        uint64_t& dropped) = 0;
   // Takes up changed settings: a line for each that differs, in `lines`. What is wrong with their file, when nothing was
   // taken up; or none.
   [[nodiscard]] virtual std::optional<std::string> reload(std::vector<std::string>& lines) = 0;

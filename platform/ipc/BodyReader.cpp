@@ -32,6 +32,10 @@ bool BodyReader::readUInt32(uint32_t& out) {
   return good() && wire::number(cursor_, out);
 }
 
+bool BodyReader::readUInt64(uint64_t& out) {
+  return good() && wire::number(cursor_, out);
+}
+
 bool BodyReader::readInt32(int32_t& out) {
   uint32_t value = 0;
   if (!good() || !wire::number(cursor_, value)) return false;

@@ -37,6 +37,7 @@ class BodyReader {
   bool readUInt16(uint16_t& out);                               // q
   bool readInt32(int32_t& out);                                 // i
   bool readUInt32(uint32_t& out);                               // u
+  bool readUInt64(uint64_t& out);                               // t
   bool readDouble(double& out);                                 // d
   bool readString(String& out);                                 // s
   bool readStringView(std::string_view& out);                   // s, in place

@@ -212,6 +212,10 @@ void MessageWriter::writeUInt32(uint32_t value) {
   put32(value);
 }
 
+void MessageWriter::writeUInt64(uint64_t value) {
+  put64(value);
+}
+
 void MessageWriter::writeDouble(double value) {
   put64(std::bit_cast<uint64_t>(value));
 }

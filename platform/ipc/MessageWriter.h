@@ -55,6 +55,7 @@ class MessageWriter {
   void writeUInt16(uint16_t value);                                      // q
   void writeInt32(int32_t value);                                        // i
   void writeUInt32(uint32_t value);                                      // u
+  void writeUInt64(uint64_t value);                                      // t
   void writeDouble(double value);                                        // d
   void writeString(std::string_view text);                               // s
   void writeData(std::span<const std::byte> bytes);                      // ay

@@ -31,10 +31,10 @@ class AdministrationTest : public AgentFixture {
     bool takes = true;  // the peer reads
   };
   // The refusal, or none.
-  static std::optional<WatchRefusal> watch(const std::shared_ptr<FakeConnection>& connection,
-                                           const Dictionary& filter,
-                                           const std::shared_ptr<Told>& told = std::make_shared<Told>()) {
-    std::optional<WatchRefusal> refusal;
+  static std::optional<AdministrationRefusal> watch(
+      const std::shared_ptr<FakeConnection>& connection, const Dictionary& filter,
+      const std::shared_ptr<Told>& told = std::make_shared<Told>()) {
+    std::optional<AdministrationRefusal> refusal;
     connection->queue()->sync([&] {
       auto window = std::dynamic_pointer_cast<AdministrationInterface>(connection->anyExportedObject());
       refusal = window->watch(filter, [told](const Dictionary& passed) {
@@ -69,6 +69,7 @@ class AdministrationTest : public AgentFixture {
                                   .servers = servers_,
                                   .version = "8.0.0",
                                   .since = 1000,
+                                  .outbox = {},
                                   .connections = [] { return size_t{3}; },
                                   .process =
                                       [] {
@@ -221,7 +222,7 @@ TEST_F(AdministrationTest, ShowsBodiesToRootAndTheDaemonsUserAlone) {
   const auto member = look(1000, {4});
   const auto refused = watch(member, withBodies);
   ASSERT_NE(refused, std::nullopt);
-  EXPECT_EQ(refused->why, WatchRefusal::Why::notAllowed);
+  EXPECT_EQ(refused->why, AdministrationRefusal::Why::notAllowed);
   EXPECT_EQ(refused->text, "Only root and the daemon's own user may see what is in events");
   EXPECT_EQ(watch(member, {{"bodies", false}}), std::nullopt);
 }
@@ -268,7 +269,7 @@ TEST_F(AdministrationTest, RefusesAFilterThatItDoesNotUnderstand) {
   for (const auto& [filter, problem] : wrong) {
     const auto refused = watch(connection, filter);
     ASSERT_NE(refused, std::nullopt) << description(filter);
-    EXPECT_EQ(refused->why, WatchRefusal::Why::wrongFilter) << description(filter);
+    EXPECT_EQ(refused->why, AdministrationRefusal::Why::wrongFilter) << description(filter);
     EXPECT_TRUE(refused->text.starts_with(problem)) << refused->text;
   }
   EXPECT_FALSE(test_.books.watchers()->anybody());

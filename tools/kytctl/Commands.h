@@ -96,6 +96,12 @@ struct MetricsOptions {
   bool json = false;
 };
 
+struct OutboxDropOptions {
+  std::string server, user;  // the user by name or number; empty: any
+  bool all = false;          // meant so where neither is given
+  bool json = false;
+};
+
 struct SimulateOptions {
   std::string bag, events;  // files
   uint32_t devices = 1000;
@@ -163,6 +169,11 @@ struct SimulateOptions {
 // Prints events as they pass, until the daemon ends or this program is interrupted.
 [[nodiscard]] int watchCommand(const std::string& root, const WatchOptions& options);
 [[nodiscard]] int reloadCommand(const std::string& root, bool json);
+// What could not be sent and waits on the disk.
+[[nodiscard]] int outboxListCommand(const std::string& root, bool json);
+[[nodiscard]] int outboxShowCommand(const std::string& root, const std::string& server, bool json);
+[[nodiscard]] int outboxFlushCommand(const std::string& root, bool json);
+[[nodiscard]] int outboxDropCommand(const std::string& root, const OutboxDropOptions& options);
 
 // "kytctl: TEXT" on standard error, with control characters escaped; returns 1.
 int failed(const Error& error);

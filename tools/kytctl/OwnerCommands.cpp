@@ -27,6 +27,7 @@
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/WaitingEvents.h"
+#include "tools/kytctl/WaitingPosts.h"
 
 namespace kyt::tools {
 
@@ -137,6 +138,12 @@ class Owner {
     all.set("logs", std::move(logs));
     all.set("defaults", defaults_.values(kKYTReportingDefaultsDomain));
     all.set("leftByHour", table_.object());
+    if (DaemonLock::holder(paths_.userDefaults()) <= 0) {
+      all.set("outbox", postsThatWait(paths_));
+    } else if (WaitingPosts::of(root_, paths_, true).posts() != 0) {
+      std::fprintf(stderr,
+                   "kytctl: What waits in the outbox is counted, not written: the daemon has it open\n");
+    }
     std::string text;
     json_.writePretty(Value(all), text);
     text += '\n';
@@ -289,7 +296,8 @@ class Owner {
     for (const MessageLog& one : logs_)
       if (::unlink(one.path.c_str()) != 0 && errno != ENOENT) status = failedAt(one.path);
     bool wasKept = false;
-    for (const char* name : {"/outbox.sqlite", "/outbox.sqlite-wal", "/outbox.sqlite.damaged"}) {
+    for (const char* name :
+         {"/outbox.sqlite", "/outbox.sqlite-wal", "/outbox.sqlite-journal", "/outbox.sqlite.damaged"}) {
       const std::string kept = paths_.outbox() + name;
       if (::unlink(kept.c_str()) == 0)
         wasKept = true;

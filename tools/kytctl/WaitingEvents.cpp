@@ -49,6 +49,7 @@ WaitingEvents::WaitingEvents(const std::string& root) {
   const auto size = std::filesystem::file_size(outbox_, none);
   if (!none) outboxBytes_ = size;
   daemon_ = DaemonLock::holder(paths.userDefaults());
+  posts_ = WaitingPosts::of(root, paths, daemon_ > 0);
   if (daemon_ <= 0) return;
   auto window = WindowClient::connect(root);
   if (const auto* error = std::get_if<Error>(&window)) {
@@ -75,7 +76,8 @@ Dictionary WaitingEvents::object() const {
   }
   Dictionary all{{"daemon", daemon_ > 0 ? Value(static_cast<int64_t>(daemon_)) : Value()},
                  {"rows", std::move(rows)},
-                 {"outboxBytes", outboxBytes_}};
+                 {"outboxBytes", outboxBytes_},
+                 {"outbox", posts_.object()}};
   if (!problem_.empty()) all.set("problem", problem_);
   return all;
 }
@@ -92,7 +94,8 @@ std::string WaitingEvents::text() const {
   else
     text = rowsText();
   if (outboxBytes_ != 0)
-    text += "Kept on the disk: " + escapedText(outbox_) + ", " + bytesText(outboxBytes_) + "\n";
+    text +=
+        "Kept on the disk: " + escapedText(outbox_) + ", " + bytesText(outboxBytes_) + "\n" + posts_.text();
   return text;
 }
 

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/objects/Value.h"
+#include "tools/kytctl/WaitingPosts.h"
 
 namespace kyt::tools {
 
@@ -17,7 +18,8 @@ class WaitingEvents {
   // Beneath the root.
   explicit WaitingEvents(const std::string& root);
   // daemon (its process; null: none runs), rows of user, clientType, client, service, backEnd, internal, queued, batched,
-  // inFlight, waiting, outbox; problem (why the daemon did not say it); outboxBytes (of the file; 0: there is none).
+  // inFlight, waiting, outbox; problem (why the daemon did not say it); outboxBytes (of the file; 0: there is none), outbox
+  // (what is in it: WaitingPosts.h).
   [[nodiscard]] Dictionary object() const;
   // Lines of at most 100 characters, but for paths.
   [[nodiscard]] std::string text() const;
@@ -29,6 +31,7 @@ class WaitingEvents {
   std::vector<Dictionary> rows_;
   std::string problem_, outbox_;
   uint64_t outboxBytes_ = 0;
+  WaitingPosts posts_;
 };
 
 }  // namespace kyt::tools

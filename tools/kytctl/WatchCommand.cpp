@@ -1,7 +1,4 @@
 // kytctl watch: events as they pass, a line each, with what became of them.
-#include <pwd.h>
-
-#include <charconv>
 #include <cstdint>
 #include <cstdio>
 #include <string>
@@ -14,20 +11,13 @@
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/StatusText.h"
 #include "tools/kytctl/WindowClient.h"
+#include "tools/kytctl/WindowOutput.h"
 
 namespace kyt::tools {
 
 namespace {
 
 constexpr size_t kFateAt = 58;  // characters before the fate
-
-std::optional<uint32_t> userOf(const std::string& text) {
-  uint32_t number = 0;
-  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
-  if (error == std::errc() && end == text.data() + text.size()) return number;
-  const passwd* account = ::getpwnam(text.c_str());
-  return account != nullptr ? std::optional<uint32_t>(account->pw_uid) : std::nullopt;
-}
 
 size_t charactersIn(std::string_view text) {
   size_t count = 0;

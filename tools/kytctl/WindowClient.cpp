@@ -202,14 +202,34 @@ std::optional<Error> WindowClient::tell(std::string_view member, std::string_vie
   return std::nullopt;
 }
 
-std::optional<Error> WindowClient::watch(const Dictionary& filter) {
+std::optional<Error> WindowClient::order(std::string_view member) {
+  auto answer = call(member, std::nullopt);
+  if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
+  return std::nullopt;
+}
+
+std::variant<uint64_t, Error> WindowClient::number(std::string_view member, const Dictionary& filter) {
+  auto answer = callWith(member, filter);
+  if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
+  BodyReader in(std::get<Message>(answer));
+  uint64_t result = 0;
+  if (in.hasSignature("t")) in.readUInt64(result);
+  if (in.finish() != BodyStatus::ok) return failure("the daemon's answer is of another form");
+  return result;
+}
+
+std::variant<Message, Error> WindowClient::callWith(std::string_view member, const Dictionary& filter) {
   std::string bytes;
   MessageWriter writer(bytes);
   writer.beginCall(++serial_,
-                   {.interface = wire::kAdministrationInterface, .member = "Watch", .signature = "a{sv}"});
+                   {.interface = wire::kAdministrationInterface, .member = member, .signature = "a{sv}"});
   writer.writeDictionary(filter);
   if (!writer.end()) return failure("the question is too long");
-  auto answer = answerTo(bytes);
+  return answerTo(bytes);
+}
+
+std::optional<Error> WindowClient::watch(const Dictionary& filter) {
+  auto answer = callWith("Watch", filter);
   if (auto* error = std::get_if<Error>(&answer)) return std::move(*error);
   constexpr timeval kForEver{0, 0};
   ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &kForEver, sizeof kForEver);

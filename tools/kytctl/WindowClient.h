@@ -32,6 +32,11 @@ class WindowClient {
   // With one text as argument, without an answer but that it was done.
   [[nodiscard]] std::optional<Error> tell(std::string_view member, std::string_view argument);
 
+  // Without argument and answer.
+  [[nodiscard]] std::optional<Error> order(std::string_view member);
+  // With a filter as argument: a{sv} in, t out.
+  [[nodiscard]] std::variant<uint64_t, Error> number(std::string_view member, const Dictionary& filter);
+
   // Lets the daemon tell of events from now on; nextPassed() then waits for each, for ever.
   [[nodiscard]] std::optional<Error> watch(const Dictionary& filter);
   [[nodiscard]] std::variant<Dictionary, Error> nextPassed();
@@ -45,6 +50,7 @@ class WindowClient {
   [[nodiscard]] std::variant<Message, Error> next();
   [[nodiscard]] std::variant<Message, Error> call(std::string_view member,
                                                   const std::optional<std::string_view>& argument);
+  [[nodiscard]] std::variant<Message, Error> callWith(std::string_view member, const Dictionary& filter);
   [[nodiscard]] std::variant<Message, Error> answerTo(const std::string& question);
 
   Descriptor socket_;

@@ -7,27 +7,15 @@
 #include <vector>
 
 #include "platform/base/TextEscape.h"
-#include "platform/linux/data/RapidJSON.h"
 #include "tools/kytctl/Columns.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/StatusText.h"
 #include "tools/kytctl/WindowClient.h"
+#include "tools/kytctl/WindowOutput.h"
 
 namespace kyt::tools {
 
 namespace {
-
-void printJSON(const Value& value) {
-  std::string text;
-  RapidJSON().writeCompact(value, text);
-  std::printf("%s\n", text.c_str());
-}
-
-Value listed(const char* key, std::vector<Dictionary> rows) {
-  Array array;
-  for (Dictionary& row : rows) array.append(std::move(row));
-  return Dictionary{{key, std::move(array)}};
-}
 
 std::string backEndText(const Dictionary& backEnd, int64_t now) {
   const std::string rule = ruleText(backEnd, now);

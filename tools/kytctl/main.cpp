@@ -31,9 +31,10 @@ struct Arguments {
   RingOptions ring;
   WatchOptions watch;
   MetricsOptions metrics;
+  OutboxDropOptions drop;
   std::string script, domain, key, value, type = "string", folder, document, publicKey, oldBag, newBag;
   unsigned bits = 2048;
-  std::string level;
+  std::string level, server;
   bool json = false;
   int status = 0;
 };
@@ -323,6 +324,27 @@ void addWindow(const Command& program, Arguments& a) {
   level.runs([&a] { a.status = logLevelCommand(a.connection.root, a.level, a.json); });
 }
 
+void addOutbox(const Command& program, Arguments& a) {
+  const Command outbox = program.command("outbox", "What could not be sent and waits on the disk");
+  outbox.needsCommand();
+  const Command list = outbox.command("list", "Print what waits for each server");
+  list.flag("--json", a.json, "Print one JSON object");
+  list.runs([&a] { a.status = outboxListCommand(a.connection.root, a.json); });
+  const Command show = outbox.command("show", "Print what waits for one server, and whose it is");
+  show.option("server", a.server, "The server, as list prints it: https://events.example.org").required();
+  show.flag("--json", a.json, "Print one JSON object");
+  show.runs([&a] { a.status = outboxShowCommand(a.connection.root, a.server, a.json); });
+  const Command flush = outbox.command("flush", "Send now, whatever is waited for");
+  flush.flag("--json", a.json, "Print one JSON object");
+  flush.runs([&a] { a.status = outboxFlushCommand(a.connection.root, a.json); });
+  const Command drop = outbox.command("drop", "Delete what waits");
+  drop.option("--server", a.drop.server, "For this server alone");
+  drop.option("--user", a.drop.user, "Of this user's programs alone, by name or number");
+  drop.flag("--all", a.drop.all, "All of it");
+  drop.flag("--json", a.drop.json, "Print one JSON object");
+  drop.runs([&a] { a.status = outboxDropCommand(a.connection.root, a.drop); });
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -340,6 +362,7 @@ int main(int argc, char** argv) {
   addEntitlements(program, arguments);
   addStorebag(program, arguments);
   addWindow(program, arguments);
+  addOutbox(program, arguments);
   if (const auto status = program.parse(argc, argv)) return *status;
   return arguments.status;
 }

@@ -9,7 +9,7 @@ function __kytctl_words
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
                 --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
                 --service --storebag --program --draw --events --devices --seed \
-                --serial --expires-in-days --to --name --ca-file --identifier --set
+                --serial --expires-in-days --to --name --ca-file --identifier --set --server
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -83,6 +83,14 @@ complete -c kytctl -n __kytctl_at -a log-level -d 'What the running daemon logs'
 complete -c kytctl -n __kytctl_at -a reload -d 'Let the running daemon take up settings'
 complete -c kytctl -n __kytctl_at -a ring -d 'In which of 100 rings this device is'
 complete -c kytctl -n __kytctl_at -a watch -d 'Events as they pass'
+complete -c kytctl -n __kytctl_at -a outbox -d 'What could not be sent'
+complete -c kytctl -n '__kytctl_at outbox' -a 'list show flush drop'
+for command in list show flush drop
+    complete -c kytctl -n "__kytctl_at -b outbox $command" -l json -d 'Print JSON'
+end
+complete -c kytctl -n '__kytctl_at -b outbox drop' -l server -x -d 'For this server'
+complete -c kytctl -n '__kytctl_at -b outbox drop' -l user -x -a '(__fish_complete_users)' -d 'Of the programs of this user'
+complete -c kytctl -n '__kytctl_at -b outbox drop' -l all -d 'All of it'
 complete -c kytctl -n '__kytctl_at -b watch' -l user -x -a '(__fish_complete_users)' -d 'Of the programs of this user'
 complete -c kytctl -n '__kytctl_at -b watch' -l client -x -d 'Of clients of this name'
 complete -c kytctl -n '__kytctl_at -b watch' -l category -x -d 'Of this category'

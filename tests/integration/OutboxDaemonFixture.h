@@ -1,0 +1,123 @@
+// The built daemon with an outbox, and a server that takes, refuses or holds what comes, as the test says.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <random>
+#include <string>
+
+#include "tests/integration/DaemonProcess.h"
+#include "tests/integration/TestClient.h"
+#include "tests/support/TestHTTPServer.h"
+
+namespace kyt {
+inline constexpr int kTorvel = 5;
+
+class OutboxOfTheDaemon : public ::testing::Test {
+ protected:
+  OutboxOfTheDaemon() : daemon_(server_.url("")) {
+    const Dictionary entry{{"locale_whitelist", Array{"DE"}},
+                           {"filters", Array{}},
+                           {"sampling_threshold", 1.0},
+                           {"event_threshold", 1000},
+                           {"post_url", server_.url("/events")}};
+    const Dictionary section{{"httppost", Dictionary{{"clients", Array{entry}}}}};
+    server_.setHandler([this, document = signedBag(Dictionary{{"version", "1"}, {"vantu_internal", section}},
+                                                   propertyLists_)](const TestHTTPServer::Request& request) {
+      TestHTTPServer::Reply reply;
+      if (request.method == "GET") {
+        reply.body = document;
+        return reply;
+      }
+      const std::lock_guard lock(mutex_);
+      reply.status = percentTaken_ > static_cast<int>(random_() % 100) ? 200 : 503;
+      if (!retryAfter_.empty()) reply.headers.emplace_back("Retry-After", retryAfter_);
+      if (holds_) reply.behaviour = TestHTTPServer::Behaviour::hold;
+      ++(reply.status == 200 && !holds_ ? taken_ : failed_)[request.body];
+      return reply;
+    });
+    daemon_.root().write("etc/kytreportingd/device.toml", "ReleaseType = \"Internal\"\ncountry = \"DE\"\n");
+    consent(true);
+  }
+  void TearDown() override {
+    if (!started_) return;
+    server_.release();
+    end();
+  }
+  void settings(const std::string& more) {
+    daemon_.writeSettings("[storebag]\ninternal_host = \"" + server_.url("") + "\"\npublic_host = \"" +
+                          server_.url("") + "\"\n[log]\ntarget = \"stderr\"\n" + more);
+  }
+  void consent(bool isGiven) {
+    daemon_.root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml",
+                         std::string("consent = ") + (isGiven ? "true\n" : "false\n"));
+  }
+  void start() {
+    started_ = daemon_.startAndWait();
+    ASSERT_TRUE(started_) << daemon_.log();
+  }
+  void end() {
+    started_ = false;
+    daemon_.terminate();
+    EXPECT_EQ(daemon_.exitStatus(), 0) << daemon_.log();
+  }
+  void kill() {
+    started_ = false;
+    daemon_.terminate(SIGKILL);
+    EXPECT_EQ(daemon_.exitStatus(), -1);
+  }
+  void take(int percent) {
+    const std::lock_guard lock(mutex_);
+    percentTaken_ = percent;
+  }
+  // What its answers ask for; empty: nothing.
+  void retryAfter(const std::string& value) {
+    const std::lock_guard lock(mutex_);
+    retryAfter_ = value;
+  }
+  void hold(bool holds) {
+    const std::lock_guard lock(mutex_);
+    holds_ = holds;
+  }
+  [[nodiscard]] std::map<std::string, int> taken() const {
+    const std::lock_guard lock(mutex_);
+    return taken_;
+  }
+  [[nodiscard]] std::map<std::string, int> failed() const {
+    const std::lock_guard lock(mutex_);
+    return failed_;
+  }
+  [[nodiscard]] std::string folder() const { return daemon_.root() / "var/lib/kytreportingd/outbox"; }
+  [[nodiscard]] std::string ofProcess(const std::string& name) const {
+    std::ifstream file("/proc/" + std::to_string(daemon_.process()) + "/" + name);
+    return {std::istreambuf_iterator<char>(file), {}};
+  }
+  [[nodiscard]] bool hasThread(const std::string& name) const {
+    const std::string tasks = "/proc/" + std::to_string(daemon_.process()) + "/task";
+    for (const auto& task : std::filesystem::directory_iterator(tasks)) {
+      std::ifstream file(task.path() / "comm");
+      std::string thread;
+      if (std::getline(file, thread) && thread.starts_with(name)) return true;
+    }
+    return false;
+  }
+
+  mutable std::mutex mutex_;
+  std::mt19937 random_{1};
+  int percentTaken_ = 0;
+  std::string retryAfter_;
+  bool holds_ = false, started_ = false;
+  std::map<std::string, int> taken_, failed_;  // bodies
+  PugixmlPropertyLists propertyLists_;
+  TestHTTPServer server_;
+  DaemonProcess daemon_;
+};
+
+inline constexpr char kOn[] = "[outbox]\nenabled = true\n";
+
+}  // namespace kyt

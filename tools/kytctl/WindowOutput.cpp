@@ -1,0 +1,32 @@
+#include "tools/kytctl/WindowOutput.h"
+
+#include <pwd.h>
+
+#include <charconv>
+#include <cstdio>
+
+#include "platform/linux/data/RapidJSON.h"
+
+namespace kyt::tools {
+
+void printJSON(const Value& value) {
+  std::string text;
+  RapidJSON().writeCompact(value, text);
+  std::printf("%s\n", text.c_str());
+}
+
+Value listed(const char* key, std::vector<Dictionary> rows) {
+  Array array;
+  for (Dictionary& row : rows) array.append(std::move(row));
+  return Dictionary{{key, std::move(array)}};
+}
+
+std::optional<uint32_t> userOf(const std::string& text) {
+  uint32_t number = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
+  if (error == std::errc() && end == text.data() + text.size()) return number;
+  const passwd* account = ::getpwnam(text.c_str());
+  return account != nullptr ? std::optional<uint32_t>(account->pw_uid) : std::nullopt;
+}
+
+}  // namespace kyt::tools
