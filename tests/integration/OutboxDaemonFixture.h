@@ -10,6 +10,8 @@
 #include <mutex>
 #include <random>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/TestClient.h"
@@ -21,24 +23,20 @@ inline constexpr int kTorvel = 5;
 class OutboxOfTheDaemon : public ::testing::Test {
  protected:
   OutboxOfTheDaemon() : daemon_(server_.url("")) {
-    const Dictionary entry{{"locale_whitelist", Array{"DE"}},
-                           {"filters", Array{}},
-                           {"sampling_threshold", 1.0},
-                           {"event_threshold", 1000},
-                           {"post_url", server_.url("/events")}};
-    const Dictionary section{{"httppost", Dictionary{{"clients", Array{entry}}}}};
-    server_.setHandler([this, document = signedBag(Dictionary{{"version", "1"}, {"vantu_internal", section}},
-                                                   propertyLists_)](const TestHTTPServer::Request& request) {
+    putBag(Array{entry("plain", server_.url("/events"))});
+    server_.setHandler([this](const TestHTTPServer::Request& request) {
       TestHTTPServer::Reply reply;
+      const std::lock_guard lock(mutex_);
       if (request.method == "GET") {
-        reply.body = document;
+        reply.body = document_;
         return reply;
       }
-      const std::lock_guard lock(mutex_);
       reply.status = percentTaken_ > static_cast<int>(random_() % 100) ? 200 : 503;
       if (!retryAfter_.empty()) reply.headers.emplace_back("Retry-After", retryAfter_);
       if (holds_) reply.behaviour = TestHTTPServer::Behaviour::hold;
-      ++(reply.status == 200 && !holds_ ? taken_ : failed_)[request.body];
+      const bool isTaken = reply.status == 200 && !holds_;
+      ++(isTaken ? taken_ : failed_)[request.body];
+      if (isTaken) takenIn_[request.body].push_back(life_);
       return reply;
     });
     daemon_.root().write("etc/kytreportingd/device.toml", "ReleaseType = \"Internal\"\ncountry = \"DE\"\n");
@@ -57,9 +55,24 @@ class OutboxOfTheDaemon : public ::testing::Test {
     daemon_.root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml",
                          std::string("consent = ") + (isGiven ? "true\n" : "false\n"));
   }
+  static Dictionary entry(const std::string& client, const std::string& url) {
+    return Dictionary{{"client", client},          {"locale_whitelist", Array{"DE"}}, {"filters", Array{}},
+                      {"sampling_threshold", 1.0}, {"event_threshold", 1000},         {"post_url", url}};
+  }
+  // Before the daemon starts.
+  void putBag(Array entries) {
+    const Dictionary section{{"httppost", Dictionary{{"clients", std::move(entries)}}}};
+    const std::lock_guard lock(mutex_);
+    document_ = signedBag(Dictionary{{"version", "1"}, {"vantu_internal", section}}, propertyLists_);
+  }
   void start() {
+    nextLife();
     started_ = daemon_.startAndWait();
     ASSERT_TRUE(started_) << daemon_.log();
+  }
+  void nextLife() {
+    const std::lock_guard lock(mutex_);
+    ++life_;
   }
   void end() {
     started_ = false;
@@ -112,7 +125,10 @@ class OutboxOfTheDaemon : public ::testing::Test {
   int percentTaken_ = 0;
   std::string retryAfter_;
   bool holds_ = false, started_ = false;
-  std::map<std::string, int> taken_, failed_;  // bodies
+  std::string document_;
+  std::map<std::string, int> taken_, failed_;        // bodies
+  int life_ = 0;                                     // which daemon this is
+  std::map<std::string, std::vector<int>> takenIn_;  // each body, in which lives
   PugixmlPropertyLists propertyLists_;
   TestHTTPServer server_;
   DaemonProcess daemon_;

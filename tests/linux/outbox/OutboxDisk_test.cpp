@@ -2,12 +2,14 @@
 // killed in the middle of whatever it does.
 #include <dlfcn.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sqlite3.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <csignal>
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -19,6 +21,14 @@
 #include "tests/support/TemporaryFolder.h"
 #include "tests/support/TestPlatform.h"
 
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#define KYT_UNDER_SANITIZER 1
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+#define KYT_UNDER_SANITIZER 1
+#endif
+#endif
+
 namespace {
 
 // Which call of which name fails, and how: from that one on, so many.
@@ -27,6 +37,7 @@ struct Fault {
   int after = -1;  // negative: none fails
   int times = 1;
   int error = EIO;
+  bool waitsForNoDisk = false;
   long seen = 0;
   bool fails(const char* name) {
     if (call != name) return false;
@@ -43,7 +54,12 @@ struct Fault {
 extern "C" {
 int fdatasync(int descriptor) {
   static auto* const real = reinterpret_cast<int (*)(int)>(::dlsym(RTLD_NEXT, "fdatasync"));
+  if (fault.waitsForNoDisk) return 0;
   return fault.fails("fdatasync") ? -1 : real(descriptor);
+}
+int rename(const char* from, const char* to) {
+  static auto* const real = reinterpret_cast<int (*)(const char*, const char*)>(::dlsym(RTLD_NEXT, "rename"));
+  return fault.fails("rename") ? -1 : real(from, to);
 }
 int fsync(int descriptor) {
   static auto* const real = reinterpret_cast<int (*)(int)>(::dlsym(RTLD_NEXT, "fsync"));
@@ -224,6 +240,67 @@ TEST_F(OutboxDiskTest, ClosesItsBooksWhicheverCallOfTheSystemFails) {
   }
   std::printf("%d runs, in %d of which the call failed\n", runs, failures);
   EXPECT_GT(failures, 100);
+}
+
+TEST_F(OutboxDiskTest, BeginsAnewWhereADamagedFileCannotBeRenamed) {
+  answerEverything(false);
+  start();
+  post(0);
+  stop();
+  std::ofstream(folder_.path() + "/outbox.sqlite", std::ios::trunc) << std::string(4096, 'x');
+  fault = {"rename", 0, 1, EIO};
+  start();
+  EXPECT_EQ(fault.seen, 1);
+  fault = Fault();
+  EXPECT_EQ(test_.counters.value(Reason::outboxFileDamaged), 1U);
+  EXPECT_FALSE(std::filesystem::exists(folder_.path() + "/outbox.sqlite.damaged"));
+  post(1);
+  EXPECT_TRUE(kept_.contains(1));
+  answerEverything(true);
+  pass(std::chrono::hours(1));
+  EXPECT_EQ(taken_[1], 1);
+}
+
+// A week without the server, 100,000 posts, a restart each day, on a real file: in memory is the list of them alone.
+TEST_F(OutboxDiskTest, NeedsLittleMemoryForEachPostOfAWeeksOutage) {
+#if defined(KYT_UNDER_SANITIZER)
+  GTEST_SKIP() << "a sanitizer's memory says nothing";
+#endif
+  constexpr size_t kPostsADay = 14300, kDays = 7, kMostOfAPost = 80;
+  fault.waitsForNoDisk = true;
+  test_.random.setDraw(1799999);
+  answerEverything(false);
+  const auto inUse = [] {
+    const auto info = ::mallinfo2();
+    return info.uordblks + info.hblkhd;
+  };
+  size_t afterOneDay = 0, after = 0;
+  for (size_t day = 0; day < kDays; ++day) {
+    start();
+    for (size_t i = 0; i < kPostsADay; ++i) {
+      FailedPost failed;
+      failed.post.user = 1000;
+      failed.post.url = "https://events.example.org/v1";
+      failed.post.body = Data(std::string(200, 'x') + std::to_string(i));
+      failed.isUnanswered = true;
+      failed.mayHaveLeft = false;
+      outbox_->keep(std::move(failed), [](bool isKept) { EXPECT_TRUE(isKept); });
+      if (i % 8 == 0) test_.executor.runAll();
+    }
+    test_.executor.runAll();
+    pass(std::chrono::hours(24));
+    after = inUse();
+    if (day == 0) afterOneDay = after;
+    stop();
+  }
+  start();
+  ASSERT_EQ(outbox_->list().at(0).posts, kPostsADay * kDays);
+  const size_t each = (after - std::min(after, afterOneDay)) / (kPostsADay * (kDays - 1));
+  std::printf("%zu bytes of memory for each post\n", each);
+  EXPECT_LE(each, kMostOfAPost);
+  answerEverything(true);
+  pass(std::chrono::hours(1));
+  EXPECT_TRUE(outbox_->isEmpty());
 }
 
 // A child process keeps posts and forgets them, telling each on a pipe when it is sure; it is killed at any moment.
