@@ -117,6 +117,28 @@ TEST_P(Completion, KnowsTheOptionsCommandsAndValuesThatHelpNames) {
     expectWhatHelpNames(program);
 }
 
+// Of a program, or one of its commands, and all below it.
+void addFlags(Names& flags, const std::string& program, const std::vector<std::string>& path = {}) {
+  const Help help = helpOf(program, path);
+  flags.insert(help.flags.begin(), help.flags.end());
+  for (const std::string& command : help.commands) {
+    std::vector<std::string> deeper = path;
+    deeper.push_back(command);
+    addFlags(flags, program, deeper);
+  }
+}
+
+// The others are told by their commands' options; bash takes the word behind any other option for its value.
+TEST(CompletionOfBash, KnowsWhichOptionsTakeNoValue) {
+  Names flags = {"--help"};
+  for (const char* program : {"kytctl", "kytreportingd", "kytdevserver", "kytfeed", "kytdemo"})
+    addFlags(flags, program);
+  const std::string text = textOf("packaging/completion/bash/kytctl");
+  const size_t begin = text.find("_kyt_is_flag() {");
+  ASSERT_NE(begin, std::string::npos);
+  EXPECT_EQ(matchesIn(text.substr(begin, text.find("\n}\n", begin) - begin), "(--[a-z][a-z-]*)"), flags);
+}
+
 TEST_P(Completion, KnowsTheDomainsAndKeysThatAreReadable) {
   const std::string defaults = folder_.path() + "/var/lib/kytreportingd/defaults";
   std::filesystem::create_directories(defaults);

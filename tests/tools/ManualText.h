@@ -69,6 +69,7 @@ inline Names optionsOf(const std::string& section) {
 // What the help of a program or of one of its commands names.
 struct Help {
   Names options, commands;
+  Names flags;                          // of the options, those without a value
   std::map<std::string, Names> values;  // of options that take one of a few
 };
 
@@ -88,6 +89,8 @@ inline Help helpOf(const std::string& program, std::vector<std::string> command 
       help.options.insert(option);
       last = option;
     }
+    if (std::regex_search(line, match, std::regex("^  (--[a-z-]+)(?:  | Excludes:|$)")))
+      help.flags.insert(match[1]);
     if (std::regex_search(line, match, std::regex("^  (--[a-z-]+) TEXT:\\{([a-z,]+)\\}")))
       help.values[match[1]] = matchesIn(match[2], "([a-z]+)");
   }
