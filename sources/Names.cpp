@@ -32,7 +32,7 @@ std::string reportedUnit(std::string_view unit, const std::vector<std::string>& 
 std::string reportedProgram(std::string_view path, const std::string& root) {
   const auto below = [&](std::string_view folder) { return path.starts_with(folder); };
   const bool isSystems = (below("/usr/") && !below("/usr/local/")) || below("/bin/") || below("/sbin/") ||
-                         below("/lib") || below("/opt/");
+                         below("/lib/") || below("/lib32/") || below("/lib64/") || below("/opt/");
   if (!isSystems || path.find("/..") != std::string_view::npos || path.size() > kLongestName ||
       !isPlain(path))
     return kLocal;

@@ -22,7 +22,7 @@ constexpr seconds kLookInterval{5};
 struct Options {
   std::string journal, socket, state;
   std::vector<std::string> unitFolders;
-  int period = 900, clientType = 0;
+  int period = 900, clientType = 0, patience = 30;
   bool once = false;
 };
 
@@ -42,7 +42,8 @@ class Run {
       : program_(program),
         options_(options),
         waiting_(waiting),
-        delivery_({options.socket, program.name, static_cast<uint8_t>(options.clientType)}) {}
+        delivery_({options.socket, program.name, static_cast<uint8_t>(options.clientType),
+                   seconds(options.patience)}) {}
 
   int run() {
     auto opened = Journal::open({options_.journal, program_.systemAlone, program_.matches});
@@ -117,6 +118,9 @@ int runJournalProgram(const JournalProgram& program, int argc, char** argv) {
       .between(1, 86400)
       .showsDefault();
   line.option("--client-type", options.clientType, "The session's client type").between(5, 23).showsDefault();
+  line.option("--patience", options.patience, "Seconds that a report may take")
+      .between(1, 300)
+      .showsDefault();
   line.option("--socket", options.socket, "The daemon's socket");
   line.option("--state", options.state, "The file that says what was reported").showsDefault();
   line.option("--journal", options.journal, "A folder of journal files in place of this machine's");

@@ -54,7 +54,7 @@ TEST_F(UnitsSource, SaysThatThereIsNoDaemonAndKeepsItsPlace) {
   journal_.add(failureOf("cron.service"));
   journal_.write();
   auto all = arguments();
-  all.insert(all.end(), {"--once", "--socket", folder_ / "none"});
+  all.insert(all.end(), {"--once", "--patience", "1", "--socket", folder_ / "none"});
   const ProgramRun run = runProgram(std::string(KYT_PROGRAMS) + "/kytsource-units", all);
   EXPECT_EQ(run.status, 1);
   EXPECT_EQ(run.text, "kytsource-units: what was found waits, summed up: " + (folder_ / "none") +
