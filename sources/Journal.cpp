@@ -48,6 +48,28 @@ bool Journal::next() {
   return !isThatOne || sd_journal_next(journal_) > 0;
 }
 
+void Journal::goToEnd() {
+  skipped_.clear();
+  sd_journal_seek_tail(journal_);
+}
+
+bool Journal::previous() {
+  return sd_journal_previous(journal_) > 0;
+}
+
+std::vector<std::string> Journal::valuesOf(const char* name) const {
+  std::vector<std::string> values;
+  if (sd_journal_query_unique(journal_, name) < 0) return values;
+  const void* data = nullptr;
+  size_t size = 0;
+  while (sd_journal_enumerate_unique(journal_, &data, &size) > 0) {
+    const std::string_view text(static_cast<const char*>(data), size);
+    const size_t equals = text.find('=');
+    if (equals != std::string_view::npos) values.emplace_back(text.substr(equals + 1));
+  }
+  return values;
+}
+
 std::string Journal::field(const char* name) const {
   const void* data = nullptr;
   size_t size = 0;

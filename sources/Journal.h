@@ -34,13 +34,18 @@ class Journal {
   void goToTime(uint64_t microseconds);
   // Goes to the next entry. False: there is none (yet).
   [[nodiscard]] bool next();
+  // previous() then goes to the last entry, and on to those before it. False: there is none.
+  void goToEnd();
+  [[nodiscard]] bool previous();
 
-  // Of the entry that next() went to. At most kMostBytes of a field; empty: it has none.
+  // Of the entry that was gone to. At most kMostBytes of a field; empty: it has none.
   static constexpr size_t kMostBytes = 1024;
   [[nodiscard]] std::string field(const char* name) const;
   [[nodiscard]] uint64_t microseconds() const;  // since 1970
   [[nodiscard]] std::string cursor() const;
 
+  // Each value once that a field has in any entry, in no order; the matches count for nothing here.
+  [[nodiscard]] std::vector<std::string> valuesOf(const char* name) const;
   // The time of the oldest entry of anyone that is still there, in microseconds since 1970.
   [[nodiscard]] std::optional<uint64_t> oldest() const;
   // Readable when something may have been written; then takeNews() before the next look.

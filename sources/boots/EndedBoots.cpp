@@ -1,0 +1,111 @@
+#include "sources/boots/EndedBoots.h"
+
+#include <algorithm>
+#include <charconv>
+
+#include "sources/Journal.h"
+
+namespace kyt::sources {
+
+namespace {
+
+constexpr char kStarted[] = "MESSAGE_ID=39f53479d3a045ac8e11786248231fbf";
+constexpr char kStartupFinished[] = "MESSAGE_ID=b07a249cd024414a82dd00cd181378ff";
+constexpr int kMostKernelLines = 1000;  // from the end; a panic is among the last
+
+std::unique_ptr<Journal> openJournal(const std::string& folder, std::vector<std::string> matches,
+                                     std::string& problem) {
+  auto opened = Journal::open({folder, true, std::move(matches)});
+  if (auto* why = std::get_if<std::string>(&opened)) {
+    problem = std::move(*why);
+    return nullptr;
+  }
+  return std::get<std::unique_ptr<Journal>>(std::move(opened));
+}
+
+// Of the target that the service manager reached last, on its way to the end; empty: it reached none.
+std::string orderlyEnd(const std::string& folder, const std::string& boot, std::string& problem) {
+  static constexpr std::pair<const char*, const char*> kTargets[] = {{"reboot.target", "reboot"},
+                                                                     {"poweroff.target", "power-off"},
+                                                                     {"halt.target", "halt"},
+                                                                     {"kexec.target", "kexec"},
+                                                                     {"shutdown.target", "shutdown"}};
+  std::vector<std::string> matches = {"_BOOT_ID=" + boot, "_PID=1", kStarted};
+  for (const auto& [target, reason] : kTargets) matches.push_back(std::string("UNIT=") + target);
+  const auto journal = openJournal(folder, std::move(matches), problem);
+  std::string end;
+  if (!journal) return end;
+  journal->goToTime(0);
+  while (journal->next()) {
+    const std::string unit = journal->field("UNIT");
+    for (const auto& [target, reason] : kTargets)
+      if (unit == target && (end.empty() || std::string_view(reason) != "shutdown")) end = reason;
+  }
+  return end;
+}
+
+bool kernelPanicked(const std::string& folder, const std::string& boot, std::string& problem) {
+  const auto journal = openJournal(folder, {"_BOOT_ID=" + boot, "_TRANSPORT=kernel"}, problem);
+  if (!journal) return false;
+  journal->goToEnd();
+  for (int line = 0; line < kMostKernelLines && journal->previous(); ++line)
+    if (journal->field("MESSAGE").starts_with("Kernel panic")) return true;
+  return false;
+}
+
+std::optional<EndedBoot> timesOf(const std::string& folder, const std::string& boot, std::string& problem) {
+  const auto journal = openJournal(folder, {"_BOOT_ID=" + boot}, problem);
+  if (!journal) return std::nullopt;
+  EndedBoot found;
+  found.boot = boot;
+  journal->goToTime(0);
+  if (!journal->next()) return std::nullopt;
+  found.began = journal->microseconds();
+  journal->goToEnd();
+  if (!journal->previous()) return std::nullopt;
+  found.ended = journal->microseconds();
+  return found;
+}
+
+}  // namespace
+
+EndedBoots endedBoots(const std::string& folder, const std::string& current, uint64_t after,
+                      bool watchdogFired) {
+  EndedBoots result;
+  const auto journal = openJournal(folder, {}, result.problem);
+  if (!journal) return result;
+  for (const std::string& boot : journal->valuesOf("_BOOT_ID")) {
+    if (boot == current) continue;
+    const auto found = timesOf(folder, boot, result.problem);
+    if (found && found->ended > after) result.boots.push_back(*found);
+  }
+  std::sort(result.boots.begin(), result.boots.end(),
+            [](const EndedBoot& a, const EndedBoot& b) { return a.ended < b.ended; });
+  for (EndedBoot& boot : result.boots) {
+    boot.reason = orderlyEnd(folder, boot.boot, result.problem);
+    if (!boot.reason.empty()) continue;
+    const bool isLast = &boot == &result.boots.back();
+    boot.reason = kernelPanicked(folder, boot.boot, result.problem) ? "panic"
+                  : isLast && watchdogFired                         ? "watchdog"
+                                                                    : "unclean";
+  }
+  return result;
+}
+
+std::optional<uint64_t> startupMilliseconds(const std::string& folder, const std::string& boot) {
+  std::string problem;
+  const auto journal = openJournal(folder, {"_BOOT_ID=" + boot, "_PID=1", kStartupFinished}, problem);
+  if (!journal) return std::nullopt;
+  journal->goToTime(0);
+  if (!journal->next()) return std::nullopt;
+  uint64_t sum = 0;
+  for (const char* part : {"KERNEL_USEC", "INITRD_USEC", "USERSPACE_USEC"}) {
+    const std::string text = journal->field(part);
+    uint64_t microseconds = 0;
+    std::from_chars(text.data(), text.data() + text.size(), microseconds);
+    sum += microseconds;
+  }
+  return sum / 1000;
+}
+
+}  // namespace kyt::sources

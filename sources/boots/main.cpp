@@ -1,0 +1,166 @@
+// kytsource-boots: once after each start of the system, reports how earlier runs ended, and that this one began; then it
+// ends. One thread besides the library's.
+#include <algorithm>
+#include <charconv>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+#include "platform/base/TextEscape.h"
+#include "platform/linux/cli/CommandLine.h"
+#include "sources/Delivery.h"
+#include "sources/State.h"
+#include "sources/Waiting.h"
+#include "sources/boots/EndedBoots.h"
+
+namespace kyt::sources {
+namespace {
+
+using std::chrono::seconds;
+using std::chrono::steady_clock;
+
+constexpr char kName[] = "kytsource-boots";
+constexpr uint32_t kCategory = 303, kEnded = 1, kBegan = 2;
+constexpr uint64_t kMicroseconds = 1'000'000;
+constexpr size_t kMostBoots = 100;  // in one report; of more, the latest
+
+struct Options {
+  std::string socket, state, journal, root, boot;
+  int clientType = 12, patience = 30, settle = 300, retry = 900;
+  bool once = false;
+};
+
+// The kernel's, as the journal writes it: without hyphens.
+std::string currentBoot(const Options& options) {
+  std::string text;
+  std::ifstream(options.root + "/proc/sys/kernel/random/boot_id") >> text;
+  std::erase(text, '-');
+  return text;
+}
+
+// The bit that Linux's interface to watchdogs has for "reset the machine before".
+bool watchdogFired(const Options& options) {
+  constexpr unsigned kCardReset = 0x20;
+  std::error_code error;
+  for (const auto& device :
+       std::filesystem::directory_iterator(options.root + "/sys/class/watchdog", error)) {
+    std::string text;
+    if (!(std::ifstream(device.path() / "bootstatus") >> text)) continue;
+    if ((std::strtoul(text.c_str(), nullptr, 0) & kCardReset) != 0) return true;
+  }
+  return false;
+}
+
+// The state's position: "@", the end of the last run that was told, ";", the run whose beginning was told.
+struct Told {
+  uint64_t until = 0;
+  std::string began;
+};
+Told toldBy(const std::string& position) {
+  Told told;
+  if (!position.starts_with("@")) return told;
+  std::from_chars(position.data() + 1, position.data() + position.size(), told.until);
+  if (const size_t at = position.find(';'); at != std::string::npos) told.began = position.substr(at + 1);
+  return told;
+}
+
+class Boots {
+ public:
+  explicit Boots(const Options& options)
+      : options_(options),
+        current_(options.boot.empty() ? currentBoot(options) : options.boot),
+        delivery_(
+            {options.socket, kName, static_cast<uint8_t>(options.clientType), seconds(options.patience)}) {}
+
+  int run(Waiting& waiting) {
+    // Until the service manager is done with the start, so that it can say how long that took.
+    const auto settled = steady_clock::now() + seconds(options_.once ? 0 : options_.settle);
+    while (!startupMilliseconds(options_.journal, current_) && steady_clock::now() < settled)
+      if (waiting.wait(-1, std::min(settled, steady_clock::now() + seconds(10))) == Waiting::Woken::stop)
+        return 0;
+    while (!report()) {
+      if (options_.once) return 1;
+      if (waiting.wait(-1, steady_clock::now() + seconds(options_.retry)) == Waiting::Woken::stop) return 0;
+    }
+    return 0;
+  }
+
+ private:
+  bool report() {
+    State state = readState(options_.state).value_or(State{});
+    Told told = toldBy(state.position);
+    const bool isFirst = state.position.empty();
+    EndedBoots ended = endedBoots(options_.journal, current_, told.until, watchdogFired(options_));
+    if (!ended.problem.empty()) return tell(ended.problem);
+    if (!ended.boots.empty()) told.until = ended.boots.back().ended;
+    // What was before the service was enabled is not told.
+    if (isFirst) ended.boots.clear();
+    if (ended.boots.size() > kMostBoots)
+      ended.boots.erase(ended.boots.begin(), ended.boots.end() - static_cast<ptrdiff_t>(kMostBoots));
+    const std::vector<SourceEvent> events = eventsOf(ended.boots, told.began != current_, state.report);
+    const std::vector<bool> taken = delivery_.deliver(events);
+    if (std::find(taken.begin(), taken.end(), false) != taken.end())
+      return tell("the report waits: " + delivery_.problem());
+    if (!events.empty()) ++state.report;
+    state.position = "@" + std::to_string(told.until) + ";" + current_;
+    if (const auto problem = writeState(options_.state, state)) tell(*problem);
+    return true;
+  }
+  [[nodiscard]] std::vector<SourceEvent> eventsOf(const std::vector<EndedBoot>& boots, bool tellsBegin,
+                                                  uint64_t report) const {
+    std::vector<SourceEvent> events;
+    for (const EndedBoot& boot : boots)
+      events.push_back({kCategory, kEnded,
+                        Dictionary{{"reason", boot.reason},
+                                   {"seconds", (boot.ended - boot.began) / kMicroseconds},
+                                   {"ended", boot.ended / kMicroseconds},
+                                   {"report", report}}});
+    if (!tellsBegin) return events;
+    SourceEvent began{kCategory, kBegan, Dictionary{{"report", report}}};
+    if (const auto startup = startupMilliseconds(options_.journal, current_))
+      began.payload.set("startupMilliseconds", *startup);
+    events.push_back(std::move(began));
+    return events;
+  }
+  static bool tell(const std::string& problem) {
+    std::fprintf(stderr, "%s: %s\n", kName, escapedText(problem).c_str());
+    return false;
+  }
+
+  const Options& options_;
+  const std::string current_;
+  Delivery delivery_;
+};
+
+}  // namespace
+}  // namespace kyt::sources
+
+int main(int argc, char** argv) {
+  using namespace kyt::sources;
+  Options options;
+  const char* folder = std::getenv("STATE_DIRECTORY");
+  options.state = (folder != nullptr ? std::string(folder) : "/var/lib/" + std::string(kName)) + "/state";
+  const kyt::CommandLine line(kName, "Reports how earlier runs of the system ended, and that it started");
+  line.option("--settle", options.settle, "Seconds to wait for the end of the start")
+      .between(0, 3600)
+      .showsDefault();
+  line.option("--retry", options.retry, "Seconds until a report is tried again")
+      .between(1, 86400)
+      .showsDefault();
+  line.option("--client-type", options.clientType, "The session's client type").between(5, 23).showsDefault();
+  line.option("--patience", options.patience, "Seconds that a report may take")
+      .between(1, 300)
+      .showsDefault();
+  line.option("--socket", options.socket, "The daemon's socket");
+  line.option("--state", options.state, "The file that says what was reported").showsDefault();
+  line.option("--journal", options.journal, "A folder of journal files in place of this machine's");
+  line.option("--root", options.root, "A folder in front of /proc and /sys");
+  line.option("--boot", options.boot, "The identifier of this run, as the journal has it");
+  line.flag("--once", options.once, "Wait for nothing, and try once");
+  if (const auto status = line.parse(argc, argv)) return *status;
+  Waiting waiting;
+  if (!waiting.works()) return 1;
+  return Boots(options).run(waiting);
+}
