@@ -69,7 +69,7 @@ void OutboxBooks::tellWatchers(int64_t post, const Events& events, std::optional
     PassedEvent event = known->second.tally->passed(EventKind(), dropped);
     event.backEnd = row.backEnd;
     for (uint64_t left = std::min(count, known->second.events); left > 0; --left)
-      books_.watchers()->tell(event);
+      if (books_.watchers()->want(event.program, event.kind)) books_.watchers()->tell(event);
   }
 }
 
