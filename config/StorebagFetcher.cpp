@@ -209,8 +209,10 @@ bool StorebagFetcher::verifiesSHA256(const URLReply& reply) const {
 
 std::optional<std::string> StorebagFetcher::refusal(const std::optional<String>& name, const URLReply& reply,
                                                     const Dictionary& bag) {
-  if (guard_.requiresSHA256() && !verifiesSHA256(reply))
-    return std::string("it has no \"") + kStorebagSignature256 + "\" that verifies";
+  if (guard_.requiresSHA256() && !verifiesSHA256(reply)) {
+    std::string text = "it has no \"";
+    return text.append(kStorebagSignature256).append("\" that verifies");
+  }
   return name ? guard_.refusal(*name, bag) : std::nullopt;
 }
 
