@@ -32,6 +32,7 @@ struct SQLiteLibrary {
   // Loads it, or says why that failed.
   [[nodiscard]] static std::variant<SQLiteLibrary, std::string> load(const char* name);
 
+// NOLINTNEXTLINE(bugprone-macro-parentheses): a name that is declared cannot stand in parentheses
 #define ROW(here, there) decltype(::there)* here = nullptr;
   KYT_SQLITE_FUNCTIONS(ROW)
 #undef ROW
