@@ -87,7 +87,7 @@ uint64_t Journal::microseconds() const {
 std::string Journal::cursor() const {
   char* text = nullptr;
   if (sd_journal_get_cursor(journal_, &text) < 0) return {};
-  const std::string cursor(text);
+  std::string cursor(text);
   std::free(text);
   return cursor;
 }
