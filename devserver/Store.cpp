@@ -212,10 +212,12 @@ void Store::write(Pending& pending) {
   if (!writer_->execute("COMMIT")) writer_->execute("ROLLBACK");
 }
 
-// A device sends a post again byte for byte: its body names it.
+// A device sends a post of events again byte for byte: its body, which holds the device and the moment, names it. Two
+// uploads may well have the same contents.
 void Store::nameBody(Post& post) {
   if (post.body.empty()) return;
   post.sha256 = sha256Of(post.body);
+  if (post.clientId.empty()) return;
   firstOfBody_.bind(post.sha256);
   if (firstOfBody_.step() && !firstOfBody_.isNull(0)) post.repeats = firstOfBody_.integer(0);
   firstOfBody_.reset();
