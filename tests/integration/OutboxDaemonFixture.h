@@ -105,6 +105,10 @@ class OutboxOfTheDaemon : public ::testing::Test {
     const std::lock_guard lock(mutex_);
     return failed_;
   }
+  [[nodiscard]] std::map<std::string, std::vector<int>> takenIn() const {
+    const std::lock_guard lock(mutex_);
+    return takenIn_;
+  }
   [[nodiscard]] std::string folder() const { return daemon_.root() / "var/lib/kytreportingd/outbox"; }
   [[nodiscard]] std::string ofProcess(const std::string& name) const {
     std::ifstream file("/proc/" + std::to_string(daemon_.process()) + "/" + name);

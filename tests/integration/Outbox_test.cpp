@@ -148,7 +148,7 @@ TEST_F(OutboxOfTheDaemon, LosesNothingThatItHadKeptHoweverOftenItIsKilled) {
   end();
   // One daemon sends nothing twice that was taken; the next one at most what was on its way when the first was killed.
   std::map<int, int> repeats;
-  for (const auto& [body, lives] : takenIn_)
+  for (const auto& [body, lives] : takenIn())
     for (size_t i = 1; i < lives.size(); ++i) {
       EXPECT_NE(lives[i], lives[i - 1]);
       ++repeats[lives[i - 1]];

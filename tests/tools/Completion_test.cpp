@@ -131,7 +131,7 @@ void addFlags(Names& flags, const std::string& program, const std::vector<std::s
 // The others are told by their commands' options; bash takes the word behind any other option for its value.
 TEST(CompletionOfBash, KnowsWhichOptionsTakeNoValue) {
   Names flags = {"--help"};
-  for (const char* program : {"kytctl", "kytreportingd", "kytdevserver", "kytfeed", "kytdemo"})
+  for (const char* program : {"kytctl", "kytreportingd", "kytreceiver", "kytdevserver", "kytfeed", "kytdemo"})
     addFlags(flags, program);
   const std::string text = textOf("packaging/completion/bash/kytctl");
   const size_t begin = text.find("_kyt_is_flag() {");
