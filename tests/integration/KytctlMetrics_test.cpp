@@ -35,7 +35,7 @@ class KytctlMetrics : public StageTest {
     lay();
     putBag("cadmor", {entry("a")});
     startDaemon();
-    for (const char* name : {"a \"quoted\" \\ name\n", "a"}) {
+    for (const char* name : {"a \"quoted\" \\ name\n", "a \"quoted\" \\ name\\n", "a"}) {
       TestClient client(socket(), 7, name);
       EXPECT_NE(client.configure(), "none");
       EXPECT_TRUE(client.send(5, 1, {}));
@@ -86,7 +86,7 @@ TEST_F(KytctlMetrics, AreInTheOpenMetricsFormat) {
   const Figures figures = read(lines, "", true);
   EXPECT_NE(figures.values.at("kytreportingd_threads"), "0");
   EXPECT_TRUE(figures.values.count("kytreportingd_events_dropped_total")) << run.text;
-  EXPECT_NE(run.text.find(R"(client="a \"quoted\" \\ name\\n")"), std::string::npos) << run.text;
+  EXPECT_NE(run.text.find(R"(client="a \"quoted\" \\x5c name\\n")"), std::string::npos) << run.text;
 }
 
 TEST_F(KytctlMetrics, AreTheSameInTheOlderTextFormat) {
