@@ -70,7 +70,7 @@ KeptPosts::Entry* KeptPosts::oldestOf(ServerLine& line) {
 KeptPosts::Entry* KeptPosts::dueAside(ServerLine& line, MonotonicTime now, const Entry* before) {
   for (const auto& [number, aside] : line.aside) {
     if (before != nullptr && before->number < number) break;
-    if (aside.strikes != 0 ? now < aside.notBefore : aside.wasTried) continue;
+    if (aside.waitsAlone() ? now < aside.notBefore : aside.wasTried) continue;
     if (Entry* entry = find(number); entry != nullptr && !entry->isInFlight) return entry;
   }
   return nullptr;
@@ -88,7 +88,7 @@ std::optional<MonotonicTime> KeptPosts::whenDue(const ServerLine& line) {
   std::optional<MonotonicTime> soonest;
   if (line.posts > line.aside.size()) return soonest;
   for (const auto& [number, aside] : line.aside) {
-    if (aside.strikes == 0) return std::nullopt;
+    if (!aside.waitsAlone()) return std::nullopt;
     soonest = std::min(soonest.value_or(aside.notBefore), aside.notBefore);
   }
   return soonest;
@@ -111,6 +111,17 @@ ServerLine::Aside* KeptPosts::standAsideOrStrike(Entry& entry) {
   line.aside[entry.number] = {};
   entry.isAside = true;
   return nullptr;
+}
+
+ServerLine::Aside& KeptPosts::setUnread(Entry& entry) {
+  entry.isAside = true;
+  return entry.line->aside[entry.number];
+}
+
+void KeptPosts::delay(Entry& entry, MonotonicTime until) {
+  const auto known = entry.line->aside.find(entry.number);
+  if (known == entry.line->aside.end() || !known->second.waitsAlone()) return;
+  known->second.notBefore = std::max(known->second.notBefore, until);
 }
 
 void KeptPosts::comeBack(ServerLine& line, bool all) {

@@ -22,9 +22,13 @@ class URLSession;
 struct ServerLine {
   // A post that failed although it left, so that it may be the reason itself: the line goes on with the next one.
   struct Aside {
-    bool wasTried = true;       // since the server took one
-    unsigned strikes = 0;       // times that it failed while the server took others
-    MonotonicTime notBefore{};  // with strikes: its own next try
+    bool wasTried = true;  // since the server took one
+    unsigned strikes = 0;  // times that it failed while the server took others
+    unsigned unread = 0;   // times that the disk did not give it although it did other work
+    unsigned unreadTries = 0;
+    uint64_t workBefore = 0;    // of the disk, when it did not give it
+    MonotonicTime notBefore{};  // where it waits alone: its own next try
+    [[nodiscard]] bool waitsAlone() const { return strikes != 0 || unread != 0; }
   };
   // Posts of two identities never share a connection.
   struct Sender {
@@ -56,6 +60,7 @@ class KeptPosts {
     ServerLine* line = nullptr;
     int64_t born = 0;  // monotonic seconds
     uint32_t bytes = 0, user = 0;
+    uint16_t contents = 0;  // OutboxBooks::remember()
     bool isByConsent = false, isInFlight = false, isGone = false, isAside = false;
   };
 
@@ -78,6 +83,10 @@ class KeptPosts {
     // Many in a row say that the server fails after all.
     return isNew && ++entry.line->newStrikes % kMostNewStrikes == 0;
   }
+  // The disk does not give it: it waits alone, for as long as its caller says there.
+  [[nodiscard]] static ServerLine::Aside& setUnread(Entry& entry);
+  // It is not sent before that time, where it waits alone.
+  static void delay(Entry& entry, MonotonicTime until);
   // The server took one: those that stand aside come again, in their order. `all`: also those that wait for their own time.
   static void comeBack(ServerLine& line, bool all = false);
   // The oldest that nobody is sending, of a user, of all; null: none.

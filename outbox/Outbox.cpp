@@ -46,6 +46,10 @@ bool Outbox::isTaking() const {
   return ports_.clock.monotonic() >= diskRestsUntil_;
 }
 
+bool Outbox::isConsentGiven() const {
+  return ports_.consent.isSubmissionAllowed();
+}
+
 void Outbox::refuse(Incoming& post) {
   if (ports_.counters.addAndMayLog(Reason::postNotKept, ports_.clock.monotonic()))
     ports_.log.error("Outbox(keep): A post to %s that failed cannot be kept",
@@ -132,6 +136,7 @@ void Outbox::turn() {
     if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) ports_.store.becameEmpty();
   }
   posts_.forgetGone();
+  if (posts_.size() == 0) books_.forgetContents();
   books_.forgetUnwatched();
   size_.store(posts_.size(), std::memory_order_relaxed);
   if (isClosed_) return ports_.store.close();
@@ -140,40 +145,8 @@ void Outbox::turn() {
   setTimer();
 }
 
-void Outbox::load() {
-  if (!isTaking()) return;
-  const auto problem = ports_.store.open([this](StoredPostHead head) {
-    queue_->assertCurrent();
-    StoredPost& post = head.post;
-    posts_.add(post.number, serverOfLine(post.url), head.bytes, post.user, post.isByConsent,
-               bornAt(post.keptAt));
-    last_ = post.number;
-    books_.restore(post.events);
-  });
-  if (problem && problem->kind == PostStoreProblem::Kind::unavailable) {
-    // Once more, from the beginning.
-    books_.dropRest(Reason::outboxUnreadable);
-    posts_.clear();
-    return handle(*problem);
-  }
-  isLoaded_ = true;
-  if (problem) return handle(*problem);
-  if (posts_.size() == 0) return;
-  ports_.log.normal("Outbox: %zu posts of %llu bytes are left from before", posts_.size(),
-                    static_cast<unsigned long long>(posts_.bytes()));
-  // Devices that start at the same time do not all ask at the same time.
-  for (auto& [server, line] : posts_.lines()) fail(line, std::nullopt, true);
-}
-
-OutboxBooks::Events Outbox::eventsOf(int64_t number) {
-  if (const auto sending = inFlight_.find(number); sending != inFlight_.end()) return sending->second->events;
-  auto read = ports_.store.read(number);
-  if (auto* post = std::get_if<StoredPost>(&read)) return std::move(post->events);
-  return {};
-}
-
 void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
-  const OutboxBooks::Events events = eventsOf(entry.number);
+  const OutboxBooks::Events events = eventsOf(entry);
   if (const auto sending = inFlight_.find(entry.number); sending != inFlight_.end()) {
     sending->second->isAbandoned = true;
     if (sending->second->task) sending->second->task->cancel();
@@ -184,8 +157,8 @@ void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
 }
 
 void Outbox::forgetWithoutConsent() {
-  const bool wasGiven = std::exchange(isConsentGiven_, ports_.consent.isSubmissionAllowed());
-  if (isConsentGiven_) return;
+  const bool wasGiven = std::exchange(wasConsentGiven_, ports_.consent.isSubmissionAllowed());
+  if (wasConsentGiven_) return;
   if (wasGiven) ports_.store.removeSetAside();  // nobody knows what is in it
   if (posts_.byConsent() == 0) return;
   ports_.log.normal("Outbox: The consent is withdrawn, %zu posts that were collected by it are deleted",
@@ -231,7 +204,7 @@ bool Outbox::makeRoom(Plan& plan, uint32_t user, uint64_t bytes) {
     if (!isShareFull && !isFull) return true;
     KeptPosts::Entry* oldest = isShareFull ? posts_.oldestOfUser(user) : posts_.oldest();
     if (oldest == nullptr || oldest->number > last_) return false;
-    plan.displaced.push_back(oldest->number);
+    plan.displaced.emplace_back(oldest->number, eventsOf(*oldest));
     posts_.remove(*oldest);
   }
 }
@@ -244,7 +217,7 @@ void Outbox::keepAll(std::vector<Incoming> posts) {
     const uint64_t bytes = PostStore::bytesOf(post);
     const bool fits =
         bytes <= settings_.maxBytes && bytes <= settings_.maxBytesPerUser && bytes <= UINT32_MAX;
-    if (!isLoaded_ || !fits || !isTaking() || (post.isByConsent && !isConsentGiven_)) {
+    if (!isLoaded_ || !fits || !isTaking() || (post.isByConsent && !wasConsentGiven_)) {
       refuse(incoming);
       continue;
     }
@@ -259,40 +232,19 @@ void Outbox::keepAll(std::vector<Incoming> posts) {
     post.number = last_ + 1 + static_cast<int64_t>(plan.posts.size());
     post.keptAt = now >= kClockWasSet ? now : 0;
     post.events = incoming.failed.booked ? incoming.failed.booked->rows() : OutboxBooks::Events();
-    posts_.add(post.number, serverOfLine(post.url), bytes, post.user, post.isByConsent, seconds());
+    posts_.add(post.number, serverOfLine(post.url), bytes, post.user, post.isByConsent, seconds()).contents =
+        books_.remember(post.events);
     plan.posts.push_back(std::move(incoming));
   }
   commit(std::move(plan));
 }
 
-void Outbox::commit(Plan plan) {
-  if (plan.posts.empty() && plan.displaced.empty() && removed_.empty()) return;
-  if (!isTaking()) return notKept(plan);
-  std::vector<OutboxBooks::Events> displaced;
-  displaced.reserve(plan.displaced.size());
-  for (const int64_t number : plan.displaced) displaced.push_back(eventsOf(number));
-  std::vector<const StoredPost*> added;
-  added.reserve(plan.posts.size());
-  for (const Incoming& post : plan.posts) added.push_back(&post.failed.post);
-  const size_t removedBefore = removed_.size();
-  removed_.insert(removed_.end(), plan.displaced.begin(), plan.displaced.end());
-  if (const auto problem = ports_.store.change(added, removed_, removesForGood_)) {
-    removed_.resize(removedBefore);
-    notKept(plan);
-    return handle(*problem);
-  }
-  removed_.clear();
-  removesForGood_ = false;
-  kept(plan, displaced);
-}
-
-void Outbox::kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced) {
-  for (size_t i = 0; i < displaced.size(); ++i)
-    books_.drop(plan.displaced[i], displaced[i], Reason::outboxDisplaced);
-  if (!displaced.empty() &&
+void Outbox::kept(Plan& plan) {
+  for (const auto& [number, events] : plan.displaced) books_.drop(number, events, Reason::outboxDisplaced);
+  if (!plan.displaced.empty() &&
       ports_.counters.addAndMayLog(Reason::outboxDisplaced, ports_.clock.monotonic(), 0))
     ports_.log.error("Outbox(keep): It is full, %zu of the oldest posts are lost for newer ones",
-                     displaced.size());
+                     plan.displaced.size());
   for (Incoming& incoming : plan.posts) {
     last_ = incoming.failed.post.number;
     const StoredPost& post = incoming.failed.post;
@@ -305,7 +257,7 @@ void Outbox::kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced)
     if (line.posts == 1 && line.inFlight == 0) line.failures = 0;
     if (line.inFlight == 0 && line.failures == 0)
       fail(line, incoming.failed.retryAfter, incoming.failed.isUnanswered);
-    else if (line.failures != 0 && incoming.failed.retryAfter)
+    else if (incoming.failed.retryAfter)
       pause(line, *incoming.failed.retryAfter);
     incoming.settled(true);
   }
@@ -316,28 +268,7 @@ void Outbox::notKept(Plan& plan) {
     posts_.removeNewest();
     refuse(incoming);
   }
-  for (const int64_t number : plan.displaced) posts_.putBack(number);
-}
-
-void Outbox::handle(const PostStoreProblem& problem) {
-  if (problem.kind == PostStoreProblem::Kind::damaged) {
-    ports_.counters.add(Reason::outboxFileDamaged);
-    ports_.log.error("Outbox: Its file is damaged, %zu posts are lost: %s; %s", posts_.size(),
-                     problem.text.c_str(), ports_.store.setAside().c_str());
-    for (auto& [number, sending] : inFlight_) sending->isAbandoned = true;
-    posts_.clear();
-    removed_.clear();
-    removesForGood_ = false;
-    books_.dropRest(Reason::outboxUnreadable);
-    if (!isConsentGiven_) ports_.store.removeSetAside();
-    return;
-  }
-  {
-    MutexLock lock(mutex_);
-    diskRestsUntil_ = ports_.clock.monotonic() + kDiskPause;
-  }
-  if (ports_.counters.mayTell(Reason::postNotKept, problem.text, ports_.clock.monotonic()))
-    ports_.log.error("Outbox: Its file cannot be used for now: %s", problem.text.c_str());
+  for (const auto& [number, events] : plan.displaced) posts_.putBack(number);
 }
 
 bool Outbox::finishWithin(Duration patience) {

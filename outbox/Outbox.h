@@ -95,6 +95,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void keep(FailedPost post, Function<void(bool isKept)> settled);
   // Whether there is hope that a post can be kept.
   [[nodiscard]] bool isTaking() const EXCLUDES(mutex_);
+  // As the owner says at this moment. May read a small file.
+  [[nodiscard]] bool isConsentGiven() const;
   // A first post to that address was taken.
   void serverAnswers(std::string_view url) EXCLUDES(mutex_);
   // What such an answer asks for.
@@ -146,7 +148,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   // A change of the file, and of what is known of it, that happens as a whole or not.
   struct Plan {
     std::vector<Incoming> posts;
-    std::vector<int64_t> displaced;
+    std::vector<std::pair<int64_t, OutboxBooks::Events>> displaced;
   };
 
   Outbox(Ports ports, OutboxSettings settings);
@@ -163,6 +165,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void fail(ServerLine& line, std::optional<Duration> pause, bool isUnanswered) REQUIRES(*queue_);
   void failAgain(KeptPosts::Entry& entry, const Answer& answer) REQUIRES(*queue_);
   void pause(ServerLine& line, Duration length) REQUIRES(*queue_);
+  // Not before the time that the server has asked for.
+  static void setNextTry(ServerLine& line, MonotonicTime time);
   // False: it has no effect.
   bool hasten(ServerLine& line, Duration sinceLastTry) REQUIRES(*queue_);
   void hearGood(ServerLine& line) REQUIRES(*queue_);
@@ -171,15 +175,17 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void forgetWithoutConsent() REQUIRES(*queue_);
   void forgetTooOld() REQUIRES(*queue_);
   void leave(KeptPosts::Entry& entry, Reason fate) REQUIRES(*queue_);
-  [[nodiscard]] OutboxBooks::Events eventsOf(int64_t number) REQUIRES(*queue_);
+  [[nodiscard]] OutboxBooks::Events eventsOf(const KeptPosts::Entry& entry) REQUIRES(*queue_);
 
   void keepAll(std::vector<Incoming> posts) REQUIRES(*queue_);
   [[nodiscard]] bool makeRoom(Plan& plan, uint32_t user, uint64_t bytes) REQUIRES(*queue_);
   void commit(Plan plan) REQUIRES(*queue_);
-  void kept(Plan& plan, const std::vector<OutboxBooks::Events>& displaced) REQUIRES(*queue_);
+  void kept(Plan& plan) REQUIRES(*queue_);
   void notKept(Plan& plan) REQUIRES(*queue_);
   void refuse(Incoming& post);
   void handle(const PostStoreProblem& problem) REQUIRES(*queue_);
+  [[nodiscard]] bool cannotRead(KeptPosts::Entry& entry, const PostStoreProblem& problem) REQUIRES(*queue_);
+  void lose(KeptPosts::Entry& entry, const PostStoreProblem& problem) REQUIRES(*queue_);
 
   void sendWhatIsDue() REQUIRES(*queue_);
   void sendFrom(ServerLine& line) REQUIRES(*queue_);
@@ -211,8 +217,11 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   std::vector<int64_t> removed_ GUARDED_BY(*queue_);  // not yet from the file
   bool removesForGood_ GUARDED_BY(*queue_) = false;
   int64_t last_ GUARDED_BY(*queue_) = 0;
+  uint64_t diskWork_ GUARDED_BY(*queue_) = 0;      // what the disk has done well
+  unsigned unreadInARow_ GUARDED_BY(*queue_) = 0;  // posts that it did not give
+  MonotonicTime readingRestsUntil_ GUARDED_BY(*queue_){};
   bool isLoaded_ GUARDED_BY(*queue_) = false, isWatching_ GUARDED_BY(*queue_) = false;
-  bool isClosed_ GUARDED_BY(*queue_) = false, isConsentGiven_ GUARDED_BY(*queue_) = true;
+  bool isClosed_ GUARDED_BY(*queue_) = false, wasConsentGiven_ GUARDED_BY(*queue_) = true;
   TimerHandle timer_ GUARDED_BY(*queue_);
 };
 

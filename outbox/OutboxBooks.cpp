@@ -12,6 +12,23 @@ OutboxBooks::Held& OutboxBooks::held(const BookRowName& row) {
   return held;
 }
 
+uint16_t OutboxBooks::remember(const Events& events) {
+  if (const auto known = contents_.find(events); known != contents_.end()) return known->second;
+  if (contents_.size() >= Limits::maxKnownOutboxContents) return 0;
+  const auto number = static_cast<uint16_t>(contents_.size() + 1);
+  contentsByNumber_.push_back(&contents_.emplace(events, number).first->first);
+  return number;
+}
+
+const OutboxBooks::Events* OutboxBooks::remembered(uint16_t contents) const {
+  return contents != 0 ? contentsByNumber_.at(contents - 1U) : nullptr;
+}
+
+void OutboxBooks::forgetContents() {
+  contentsByNumber_.clear();
+  contents_.clear();
+}
+
 void OutboxBooks::restore(const Events& events) {
   for (const auto& [row, count] : events) {
     Held& ofRow = held(row);

@@ -19,6 +19,13 @@ class OutboxBooks {
 
   OutboxBooks(Books& books, Counters& counters) : books_(books), counters_(counters) {}
 
+  // A number for what a post holds, which needs no reading of it to be booked; 0: too many different ones are known.
+  [[nodiscard]] uint16_t remember(const Events& events);
+  // Null: not known.
+  [[nodiscard]] const Events* remembered(uint16_t contents) const;
+  // No post holds any of it any more.
+  void forgetContents();
+
   // An earlier process kept them.
   void restore(const Events& events);
   // They came from their back end, whose post got that status; null: of no back end.
@@ -46,6 +53,8 @@ class OutboxBooks {
   Books& books_;
   Counters& counters_;
   std::map<BookRowName, Held> held_;
+  std::map<Events, uint16_t> contents_;                             // Limits::maxKnownOutboxContents at most
+  std::vector<const Events*> contentsByNumber_;                     // from 1; keys of contents_
   std::map<int64_t, std::shared_ptr<const BookedEvents>> watched_;  // Limits::maxWatchedKeptPosts at most
 };
 

@@ -16,6 +16,7 @@ constexpr std::chrono::milliseconds kLongestPause = std::chrono::minutes(30);
 constexpr unsigned kMostDoublings = 9;
 // A network that comes and goes makes no server be asked more often than this.
 constexpr Duration kBetweenTries = std::chrono::seconds(5);
+constexpr int kTooManyRequests = 429, kServiceUnavailable = 503;
 
 }  // namespace
 
@@ -35,7 +36,7 @@ void Outbox::fail(ServerLine& line, std::optional<Duration> length, bool isUnans
   const bool isAnother = line.failures == 0 || now >= line.nextTry;
   if (isAnother) {
     ++line.failures;
-    line.nextTry = now + random;
+    setNextTry(line, now + random);
   }
   if (length) pause(line, *length);
 }
@@ -43,6 +44,10 @@ void Outbox::fail(ServerLine& line, std::optional<Duration> length, bool isUnans
 void Outbox::pause(ServerLine& line, Duration length) {
   line.notBefore = std::max(line.notBefore, ports_.clock.monotonic() + length);
   line.nextTry = std::max(line.nextTry, line.notBefore);
+}
+
+void Outbox::setNextTry(ServerLine& line, MonotonicTime time) {
+  line.nextTry = std::max(time, line.notBefore);
 }
 
 // There is reason to try before the time has come.
@@ -94,7 +99,7 @@ void Outbox::take(Answer& answer) {
   if (answer.verdict == PostVerdict::braked) return fail(line, answer.retryAfter, false);
   line.failures = line.hastened = 0;
   line.isHastened = false;
-  line.nextTry = line.notBefore = ports_.clock.monotonic();
+  setNextTry(line, ports_.clock.monotonic());
   takes(line);
 }
 
@@ -107,8 +112,12 @@ void Outbox::failAgain(KeptPosts::Entry& entry, const Answer& answer) {
                                                [this](unsigned strikes) { return pauseAfter(strikes); });
   if (saysSomething)
     fail(line, answer.retryAfter, answer.isUnanswered);
-  else if (answer.retryAfter)
-    pause(line, *answer.retryAfter);
+  else if (!answer.retryAfter)
+    return;
+  else if (answer.status == kTooManyRequests || answer.status == kServiceUnavailable)
+    pause(line, *answer.retryAfter);  // these speak of the whole server
+  else
+    KeptPosts::delay(entry, ports_.clock.monotonic() + *answer.retryAfter);
 }
 
 void Outbox::takes(ServerLine& line) {
@@ -149,6 +158,7 @@ void Outbox::takeNews(const Inbox& inbox) {
 // on its way.
 void Outbox::sendWhatIsDue() {
   if (isStopping_ || !isLoaded_ || !removed_.empty() || !isTaking()) return;
+  if (ports_.clock.monotonic() < readingRestsUntil_) return;
   for (auto& [server, line] : posts_.lines()) sendFrom(line);
 }
 
@@ -161,7 +171,7 @@ void Outbox::sendFrom(ServerLine& line) {
     KeptPosts::Entry* next = posts_.next(line, now);
     if (next == nullptr) {
       if (const auto due = KeptPosts::whenDue(line); due && line.inFlight == 0)
-        line.nextTry = std::max(*due, now);
+        setNextTry(line, std::max(*due, now));
       return;
     }
     if (!send(*next)) return;
@@ -186,16 +196,15 @@ bool Outbox::send(KeptPosts::Entry& entry) {
   ServerLine& line = *entry.line;
   auto read = ports_.store.read(entry.number);
   if (const auto* problem = std::get_if<PostStoreProblem>(&read)) {
-    if (problem->kind != PostStoreProblem::Kind::post) {
+    if (problem->kind == PostStoreProblem::Kind::unavailable) return cannotRead(entry, *problem);
+    if (problem->kind == PostStoreProblem::Kind::damaged)
       handle(*problem);
-      return false;
-    }
-    ports_.log.error("Outbox: A post to %s is lost: %s", line.server.c_str(), problem->text.c_str());
-    removed_.push_back(entry.number);
-    posts_.remove(entry);
-    wake();
+    else
+      lose(entry, *problem);
     return false;
   }
+  ++diskWork_;
+  unreadInARow_ = 0;
   auto& post = std::get<StoredPost>(read);
   auto sending = std::make_shared<Sending>();
   sending->number = entry.number;
@@ -248,6 +257,7 @@ void Outbox::setTimer() {
   } else if (!isStopping_) {
     for (const auto& [server, line] : posts_.lines())
       if (line.posts != 0 && line.inFlight == 0 && line.nextTry > now) next = std::min(next, line.nextTry);
+    if (readingRestsUntil_ > now) next = std::min(next, readingRestsUntil_);
   }
   timer_ =
       ports_.timers.after(std::max<Duration>(next - now, Duration(0)), queue_, [weak = weak_from_this()] {

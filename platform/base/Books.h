@@ -183,6 +183,7 @@ class BookedEvents {
   struct OfRow {
     BookRowName row;
     uint64_t events = 0;
+    friend auto operator<=>(const OfRow&, const OfRow&) = default;
   };
   [[nodiscard]] std::vector<OfRow> rows() const;
   // The outbox has them: their post has ended with that status (0: no answer came), and whoever posted them (PostedEvents)

@@ -107,6 +107,9 @@ struct Limits {
   static constexpr size_t maxOutboxBytesInFlight = 4u << 20;
   // Requests of it at a time, to all servers: servers that are silent leave room for what is posted meanwhile.
   static constexpr size_t maxOutboxRequestsInFlight = 64;
+  // Different contents of kept posts, by whose events they are and how many, that it knows without reading them: each is
+  // some 200 bytes.
+  static constexpr size_t maxKnownOutboxContents = 4096;
   // Kept posts of which it knows the events' categories, for watchers: each is some KiB.
   static constexpr size_t maxWatchedKeptPosts = 256;
 };

@@ -5,6 +5,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 
 #include "platform/PostStore.h"
@@ -17,6 +18,9 @@ class FakePostStore final : public PostStore {
     std::map<int64_t, StoredPost> posts;
     std::optional<PostStoreProblem> problem;         // what every operation meets
     std::optional<PostStoreProblem> problemForGood;  // after a change that is for good
+    std::set<int64_t> unreadable;                    // these alone, while they are there
+    std::optional<size_t> readableHeads;             // open() gets no further
+    bool readsFail = false;                          // while changes go well
     size_t changes = 0, setAside = 0;
     bool wasForGood = false;  // the last change
     bool isSetAside = false;  // something lies beside
@@ -25,7 +29,10 @@ class FakePostStore final : public PostStore {
 
   [[nodiscard]] std::optional<PostStoreProblem> open(Function<void(StoredPostHead)> found) override {
     if (disk_->problem) return disk_->problem;
+    size_t read = 0;
     for (const auto& [number, post] : disk_->posts) {
+      if (disk_->readableHeads && read++ == *disk_->readableHeads)
+        return PostStoreProblem{PostStoreProblem::Kind::unavailable, "I/O error"};
       StoredPostHead head{post, bytesOf(post)};
       head.post.headers.clear();
       head.post.body = {};
@@ -45,6 +52,8 @@ class FakePostStore final : public PostStore {
   }
   [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override {
     if (disk_->problem) return *disk_->problem;
+    if (disk_->readsFail || disk_->unreadable.contains(number))
+      return PostStoreProblem{PostStoreProblem::Kind::unavailable, "I/O error"};
     const auto known = disk_->posts.find(number);
     if (known == disk_->posts.end()) return PostStoreProblem{PostStoreProblem::Kind::post, "missing"};
     return known->second;

@@ -59,6 +59,7 @@ class OutboxWithABadPost : public OutboxTest {
       if (request.body.view() == "bad") {
         ++sentBad_;
         reply.status = badStatus_;
+        if (!retryAfter_.empty()) reply.headers = {{"Retry-After", retryAfter_}};
         if (badStatus_ == 0) reply.error = Error{kKYTURLErrorDomain, 52, "closed without an answer"};
       } else if (isDown_) {
         reply.status = 503;
@@ -69,6 +70,7 @@ class OutboxWithABadPost : public OutboxTest {
     });
   }
   int badStatus_ = 500;
+  std::string retryAfter_;
   bool isDown_ = true;
   size_t sentBad_ = 0;
   std::vector<std::string> taken_;
@@ -91,6 +93,29 @@ TEST_F(OutboxWithABadPost, HoldsNoOtherUp) {
     EXPECT_EQ(outbox_->drop({}), 1U);
     stop();
   }
+}
+
+TEST_F(OutboxWithABadPost, IsItselfLeftAloneForAsLongAsTheServerAsks) {
+  begin();
+  static_cast<void>(post("bad"));
+  static_cast<void>(post("found the server well"));
+  isDown_ = false;
+  pass(minutes(1));
+  ASSERT_EQ(outbox_->list().at(0).failingAlone, 1U);
+  retryAfter_ = "40000";
+  const size_t failed = sentBad_;
+  while (sentBad_ == failed) pass(minutes(1));
+  const size_t before = sentBad_;
+  for (int i = 0; i < 10; ++i) {
+    isDown_ = true;
+    static_cast<void>(post(std::to_string(i)));
+    isDown_ = false;
+    pass(hours(1));
+  }
+  EXPECT_EQ(taken_.size(), 11U);
+  EXPECT_EQ(sentBad_, before);
+  pass(hours(2));
+  EXPECT_GT(sentBad_, before);
 }
 
 TEST_F(OutboxWithABadPost, HoldsNoOtherUpHoweverManyItsServerDoesNotTake) {
@@ -192,6 +217,39 @@ TEST_F(OutboxTest, LeavesAServerAloneForAsLongAsItAsksButNoLongerThanADay) {
   EXPECT_EQ(sent(), 2U);
   pass(seconds(20));
   EXPECT_EQ(sent(), 3U);
+}
+
+TEST_F(OutboxTest, LeavesAServerAloneForAsLongAsItAsksThoughItTakesAnotherPost) {
+  start();
+  keepNumbered(9);
+  pass(seconds(5));
+  answer(last(), 200);
+  ASSERT_EQ(openBodies().size(), 4U);
+  const size_t first = last() - 3, before = sent();
+  answer(first, 429, {{"Retry-After", "3600"}});
+  answer(first + 1, 200);
+  answer(first + 2, 404);
+  answer(first + 3, 503);
+  pass(seconds(3595));
+  EXPECT_EQ(sent(), before);
+  pass(seconds(10));
+  EXPECT_GT(sent(), before);
+}
+
+TEST_F(OutboxTest, LeavesAServerAloneThatAsksForItInItsAnswerToANewPost) {
+  start();
+  postAndKeep("kept");
+  pass(seconds(5));
+  ASSERT_EQ(openBodies().size(), 1U);
+  const size_t again = last();
+  static_cast<void>(post("new"));
+  answer(last(), 503, {{"Retry-After", "3600"}});
+  answer(again, 200);
+  const size_t before = sent();
+  pass(seconds(3595));
+  EXPECT_EQ(sent(), before);
+  pass(seconds(10));
+  EXPECT_GT(sent(), before);
 }
 
 TEST_F(OutboxTest, LosesOnlyThePostThatAServerRefusesForGood) {
@@ -534,6 +592,57 @@ TEST_F(OutboxTest, LosesOnlyThePostThatCannotBeRead) {
   EXPECT_EQ(row().outbox, 0U);
   EXPECT_EQ(row().droppedFor(Reason::outboxUnreadable), 2U);
   EXPECT_EQ(row().delivered, 2U);
+}
+
+TEST_F(OutboxTest, GoesOnWithTheOthersWhereTheDiskDoesNotGiveOne) {
+  start();
+  waitLong();
+  keepNumbered(4);
+  postAndKeep("another server's", 1000, "https://another.example.org/v1");
+  disk_->unreadable = {1, 3};
+  pass(seconds(6));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"another server's", "1"}));
+  answer(last(), 200);
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"another server's", "3"}));
+  const auto outcome = post("new");
+  answer(last(), 503);
+  EXPECT_FALSE(outcome->response) << "it is kept";
+  EXPECT_EQ(row().droppedFor(Reason::outboxUnreadable), 0U) << "the disk may give it another time";
+  for (int i = 0; i < 20; ++i) {
+    pass(minutes(10));
+    postAndKeep("x", 1000, "https://another.example.org/v1");
+  }
+  EXPECT_EQ(row().droppedFor(Reason::outboxUnreadable), 4U) << "once for each";
+  EXPECT_EQ(row().outbox, disk_->posts.size() * 2);
+  EXPECT_FALSE(disk_->posts.contains(1) || disk_->posts.contains(3));
+}
+
+TEST_F(OutboxTest, LosesNothingToADiskThatGivesNothingForHours) {
+  start();
+  keepNumbered(20);
+  disk_->readsFail = true;
+  pass(hours(12));
+  EXPECT_TRUE(openBodies().empty());
+  EXPECT_EQ(row().outbox, 40U);
+  disk_->readsFail = false;
+  network_->setResponder([](const URLRequest&) { return std::optional(FakeURLSessionFactory::Reply()); });
+  pass(hours(1));
+  EXPECT_EQ(row().delivered, 40U);
+}
+
+TEST_F(OutboxTest, BooksNothingTwiceWhereTheDiskFailsAsItReadsItsFile) {
+  start();
+  keepNumbered(3);
+  stop();
+  disk_->readableHeads = 2;
+  start();
+  pass(minutes(10));
+  EXPECT_EQ(row().taken, 0U);
+  EXPECT_EQ(test_.counters.value(Reason::outboxUnreadable), 0U);
+  disk_->readableHeads.reset();
+  pass(Outbox::kDiskPause);
+  EXPECT_EQ(row().taken, 6U);
+  EXPECT_EQ(row().outbox, 6U);
 }
 
 TEST_F(OutboxTest, ReadsItsFileLaterWhenTheDiskDoesNotAnswerAtTheStart) {
