@@ -59,6 +59,7 @@ class OutboxSessionState : public std::enable_shared_from_this<OutboxSessionStat
     URLRequest request;
     URLCompletion completion;
     Outstanding outstanding;
+    bool isSecondTry = false;  // the first one never left, and could not be kept
   };
 
   OutboxSessionState(std::shared_ptr<OutboxURLSessionFactory::Shared> shared,
@@ -82,7 +83,7 @@ class OutboxSessionState : public std::enable_shared_from_this<OutboxSessionStat
  private:
   std::shared_ptr<URLTask> startPost(const std::shared_ptr<Post>& post) {
     URLRequest first = post->request;
-    first.neverWaits = shared_->outbox->isTaking();
+    first.neverWaits = !post->isSecondTry && shared_->outbox->isTaking();
     return session_->start(std::move(first), [self = shared_from_this(), post](auto... reply) {
       self->ended(*post, {std::move(reply)...});
     });
@@ -116,12 +117,11 @@ class OutboxSessionState : public std::enable_shared_from_this<OutboxSessionStat
 
   void settled(Post post, URLReply reply, bool isKept) {
     if (isKept) reply = URLReply();
-    if (!isKept && didNotLeave(reply.error)) {  // as without an outbox: it may wait for connectivity
-      URLRequest again = std::move(post.request);
-      session_->start(std::move(again),
-                      [self = shared_from_this(), post = std::move(post)](auto... second) mutable {
-                        post.completion(std::move(second)...);
-                      });
+    const bool mayLeave = !post.request.isByConsent || shared_->outbox->isConsentGiven();
+    if (!isKept && didNotLeave(reply.error) && !post.isSecondTry && mayLeave) {
+      // As without an outbox: it may wait for connectivity.
+      post.isSecondTry = true;
+      startPost(std::make_shared<Post>(std::move(post)));
       return;
     }
     const uint64_t owner = post.request.account ? uint64_t{post.request.account->user()} + 1 : 0;

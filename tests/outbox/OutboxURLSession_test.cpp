@@ -108,6 +108,42 @@ TEST_F(OutboxURLSessionTest, WaitsForConnectivityOnlyWhereThePostCannotBeKept) {
   EXPECT_EQ(row().delivered, 2U);
 }
 
+TEST_F(OutboxURLSessionTest, StartsNothingAgainThatWasCollectedByAConsentThatIsGone) {
+  start();
+  isByConsent_ = true;
+  for (const int32_t code : {6, 7, 45}) {
+    test_.consent.setAllowed(true);
+    const auto outcome = post();
+    test_.consent.setAllowed(false);
+    const size_t before = network_->requestCount();
+    fail(last(), code);
+    EXPECT_EQ(network_->requestCount(), before) << "it would leave once there is a network";
+    EXPECT_EQ(outcome->calls, 1);
+    EXPECT_TRUE(outcome->error);
+  }
+  EXPECT_TRUE(disk_->posts.empty());
+}
+
+TEST_F(OutboxURLSessionTest, KeepsWhatFailsAfterItWaitedForConnectivity) {
+  start();
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "disk full"};
+  const auto outcome = post();
+  fail(last());
+  disk_->problem.reset();
+  pass(Outbox::kDiskPause);
+  answer(last(), 503);
+  EXPECT_EQ(outcome->calls, 1);
+  EXPECT_FALSE(outcome->response);
+  EXPECT_EQ(disk_->posts.size(), 1U);
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "disk full"};
+  const auto lost = post();
+  fail(last());
+  ASSERT_EQ(lost->calls, 0);
+  fail(last());
+  EXPECT_EQ(lost->calls, 1) << "once is enough";
+  EXPECT_TRUE(lost->error);
+}
+
 TEST_F(OutboxURLSessionTest, KeepsWhatTheEndOfTheDaemonCutsOff) {
   start();
   const auto outcome = post();
