@@ -29,7 +29,8 @@ struct LogAnswer {
   std::string text;  // why it is refused
 };
 
-// Who publishes. Called from threads of the log's own, with no lock of its held; must not block.
+// Who publishes. Called from threads of the log's own, or from publish() where that finds at once that a message cannot go;
+// with no lock of the log's held that publish() needs. Must not block.
 class LogListener {
  public:
   virtual ~LogListener() = default;

@@ -14,6 +14,7 @@
 #include "platform/linux/cli/CommandLine.h"
 #include "platform/linux/service/LogSinks.h"
 #include "receiver/Receiver.h"
+#include "receiver/kafka/KafkaLog.h"
 #include "receiver/nats/NatsLog.h"
 
 namespace kyt::receiver {
@@ -62,13 +63,19 @@ int run(const Settings& settings, const Arguments& arguments) {
   Log lines(*sink, arguments.level == "debug"   ? LogLevel::debug
                    : arguments.level == "error" ? LogLevel::error
                                                 : LogLevel::normal);
-  if (settings.log.kind == LogKind::kafka) return fail("[log] kind = \"kafka\" is not built in yet");
+  const bool isKafka = settings.log.kind == LogKind::kafka;
+  if (arguments.makeStreams && isKafka) return fail("topics are made with the tools of their servers");
   if (arguments.makeStreams) return makeStreams(settings, lines);
-  NatsLog log(settings.log, lines);
   ReceiverOptions options;
   options.posts.refuseWith = static_cast<unsigned>(arguments.refuseWith);
   options.posts.opensPosts = arguments.check == "full";
   options.readyFile = arguments.readyFile;
+  if (isKafka) {
+    KafkaLog log(settings.log, lines);
+    if (const auto wrong = log.open()) return fail("[log]: " + *wrong);
+    return runReceiver(settings, options, log, signals, lines);
+  }
+  NatsLog log(settings.log, lines);
   return runReceiver(settings, options, log, signals, lines);
 }
 

@@ -40,6 +40,7 @@ void Load::run(unsigned device) {
       std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
     ++answered_;
+    if (options_.pause.count() > 0) std::this_thread::sleep_for(options_.pause);
     int64_t longest = longest_;
     while (longest < reply.took.count() && !longest_.compare_exchange_weak(longest, reply.took.count())) {
     }

@@ -19,7 +19,8 @@ class Load {
   struct Options {
     std::vector<uint16_t> ports;  // of receivers; each device goes to the next when one fails
     unsigned devices = 8;
-    size_t filler = 2000;  // bytes of a post, about
+    size_t filler = 2000;                // bytes of a post, about
+    std::chrono::milliseconds pause{0};  // between two posts of a device
   };
   explicit Load(Options options);
   ~Load();  // stop()

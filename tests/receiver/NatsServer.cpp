@@ -47,8 +47,9 @@ NatsServers::NatsServers(Options options) {
                        options.more + "\n";
     if (options.servers > 1) {
       text += "cluster { name: test, listen: \"127.0.0.1:" + std::to_string(routePorts_[i]) + "\", routes: [";
-      for (const uint16_t port : routePorts_) text += " \"nats://127.0.0.1:" + std::to_string(port) + "\"";
-      text += " ] }\n";
+      for (const uint16_t port : routePorts_) text += " \"nats://127.0.0.1:" + std::to_string(port) + "\",";
+      text.back() = ']';
+      text += " }\n";
     }
     folder_.write(name(i) + ".conf", text);
   }
@@ -148,9 +149,16 @@ std::optional<StoredMessage> StreamView::message(uint64_t number, const char* st
 
 std::map<std::string, int> StreamView::ids() {
   std::map<std::string, int> found;
-  const uint64_t count = messages().value_or(0);
-  for (uint64_t i = 1; i <= count; ++i)
-    if (const auto stored = message(i)) ++found[stored->headers.at("Kyt-Id")];
+  // A cluster that has just lost a server has no answer now and then.
+  std::optional<uint64_t> count;
+  if (!eventually([&] { return (count = messages()).has_value(); }))
+    throw std::runtime_error("the stream does not answer");
+  for (uint64_t i = 1; i <= *count; ++i) {
+    std::optional<StoredMessage> stored;
+    if (!eventually([&] { return (stored = message(i)).has_value(); }))
+      throw std::runtime_error("a message of the stream cannot be read");
+    ++found[stored->headers.at("Kyt-Id")];
+  }
   return found;
 }
 

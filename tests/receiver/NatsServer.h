@@ -3,6 +3,7 @@
 #pragma once
 
 #include <nats/nats.h>
+#include <signal.h>
 
 #include <cstdint>
 #include <map>

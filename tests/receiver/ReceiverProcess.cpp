@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
+#include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
 #include <zlib.h>
@@ -112,8 +113,8 @@ ReceiverProcess::ReceiverProcess(Options options) : options_(std::move(options))
   const std::string spool = options_.spool.empty() ? folder_ / "spool" : options_.spool;
   folder_.write("kytreceiver.toml",
                 "listen = \"127.0.0.1:" + std::to_string(options_.port) + "\"\nmetrics = \"127.0.0.1:0\"\n" +
-                    options_.more + "[log]\nkind = \"nats\"\nservers = " + options_.servers + "\n" +
-                    options_.log + "[spool]\npath = \"" + spool +
+                    options_.more + "[log]\nkind = \"" + options_.kind + "\"\nservers = " + options_.servers +
+                    "\n" + options_.log + "[spool]\npath = \"" + spool +
                     "\"\nmax_bytes = " + std::to_string(options_.spoolMaxBytes) + "\n[limits]\n" +
                     options_.limits + "[[path]]\nurl_path = \"/v1/events\"\n" + options_.path);
   start();
@@ -133,7 +134,7 @@ void ReceiverProcess::start() {
   tools::ChildProcess::Options how;
   how.outputFile = folder_ / "output";
   std::vector<std::string> words = options_.wrapper;
-  words.emplace_back(KYT_RECEIVER);
+  words.push_back(options_.program.empty() ? KYT_RECEIVER : options_.program);
   words.insert(words.end(), arguments.begin(), arguments.end());
   auto started = tools::ChildProcess::start(words.front(), {words.begin() + 1, words.end()}, how);
   ASSERT_TRUE(started);

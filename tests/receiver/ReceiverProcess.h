@@ -44,6 +44,8 @@ class HttpConnection {
 class ReceiverProcess {
  public:
   struct Options {
+    std::string program;  // empty: the built one
+    std::string kind = "nats";
     std::string servers;                       // of the log, as a TOML array
     std::string log;                           // further lines of [log]
     std::string path = "digest = \"none\"\n";  // of the path /v1/events
