@@ -1,4 +1,4 @@
-// The page about threads names each queue and each thread of the daemon, and none that is not there.
+// The page about threads names each queue and each thread of the daemon and of the receiver, and none that is not there.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -8,10 +8,12 @@
 namespace kyt {
 namespace {
 
-// The first group of every match in the daemon's own sources.
-Names inSources(const char* expression) {
+// The first group of every match in the sources of these folders: the daemon's own.
+Names inSources(const char* expression,
+                const std::vector<const char*>& folders = {"platform", "config", "backend", "backends",
+                                                           "session", "outbox", "daemon"}) {
   Names found;
-  for (const char* folder : {"platform", "config", "backend", "backends", "session", "outbox", "daemon"})
+  for (const char* folder : folders)
     for (const auto& entry :
          std::filesystem::recursive_directory_iterator(KYT_SOURCE_DIR "/" + std::string(folder))) {
       const std::string path = entry.path().string();
@@ -47,6 +49,16 @@ TEST(ThreadsDocument, NamesEveryThread) {
   for (const std::string& name : inTable("Threads of the daemon"))
     if (name.starts_with("kyt-"))
       documented.insert(name.ends_with("-N") ? name.substr(0, name.size() - 2) : name);
+  EXPECT_EQ(documented, threads);
+}
+
+TEST(ThreadsDocument, NamesEveryThreadOfTheReceiver) {
+  const Names threads =
+      inSources("(?:beginServiceThread\\(|pthread_self\\(\\), )\"(kyt-[a-z]+)\"", {"http", "receiver"});
+  EXPECT_GE(threads.size(), 6U);
+  Names documented;
+  for (const std::string& name : inTable("Threads of the receiver"))
+    if (name.starts_with("kyt-")) documented.insert(name);
   EXPECT_EQ(documented, threads);
 }
 
