@@ -13,7 +13,7 @@
 #include "tests/support/Eventually.h"
 #include "tests/support/Programs.h"
 #include "tests/support/TemporaryFolder.h"
-#include "tools/fleet/Front.h"
+#include "tools/demo/Ports.h"
 #include "tools/fleet/Postgres.h"
 
 namespace kyt {

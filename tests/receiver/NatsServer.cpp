@@ -1,16 +1,17 @@
 #include "tests/receiver/NatsServer.h"
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <stdexcept>
 #include <thread>
 #include <utility>
 
 #include "tests/support/Eventually.h"
+#include "tools/demo/Ports.h"
 
 namespace kyt::receiver {
 namespace {
@@ -19,26 +20,14 @@ constexpr char kProgram[] = "/usr/sbin/nats-server";
 
 }  // namespace
 
-uint16_t freePort() {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t size = sizeof address;
-  const int descriptor = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  const bool isKnown = ::bind(descriptor, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0 &&
-                       ::getsockname(descriptor, reinterpret_cast<sockaddr*>(&address), &size) == 0;
-  ::close(descriptor);
-  return isKnown ? ntohs(address.sin_port) : 0;
-}
-
 bool NatsServers::isInstalled() {
   return ::access(kProgram, X_OK) == 0;
 }
 
 NatsServers::NatsServers(Options options) {
   for (size_t i = 0; i < options.servers; ++i) {
-    ports_.push_back(freePort());
-    routePorts_.push_back(freePort());
+    ports_.push_back(tools::freePort());
+    routePorts_.push_back(tools::freePort());
   }
   for (size_t i = 0; i < options.servers; ++i) {
     std::string text = "server_name: " + name(i) + "\nlisten: \"127.0.0.1:" + std::to_string(ports_[i]) +
@@ -71,6 +60,22 @@ void NatsServers::start() {
 void NatsServers::kill(size_t index) {
   processes_[index].signal(SIGKILL);
   static_cast<void>(processes_[index].wait(kTestDeadline));
+}
+
+// The signal is on its way when kill() returns: each thread takes it when it next runs.
+void NatsServers::pause(size_t index) {
+  processes_[index].signal(SIGSTOP);
+  const std::string tasks = "/proc/" + std::to_string(processes_[index].pid()) + "/task";
+  const bool standsStill = eventually([&] {
+    const std::filesystem::directory_iterator all(tasks);
+    return std::all_of(begin(all), end(all), [](const auto& task) {
+      std::ifstream in(task.path() / "stat");
+      std::string text;
+      std::getline(in, text);
+      return text.find(") T ") != std::string::npos;
+    });
+  });
+  if (!standsStill) throw std::runtime_error("the log's server does not stand still");
 }
 
 std::string NatsServers::url(size_t index) const {

@@ -17,8 +17,6 @@
 
 namespace kyt::receiver {
 
-[[nodiscard]] uint16_t freePort();
-
 // One to three servers; three make a cluster.
 class NatsServers {
  public:
@@ -33,7 +31,8 @@ class NatsServers {
   void start(size_t index);
   void start();             // all
   void kill(size_t index);  // without a chance to say goodbye
-  void pause(size_t index) { processes_[index].signal(SIGSTOP); }
+  // It reads nothing more once this has returned.
+  void pause(size_t index);
   void resume(size_t index) { processes_[index].signal(SIGCONT); }
   [[nodiscard]] std::string url(size_t index) const;
   [[nodiscard]] std::string urlsAsToml() const;  // ["nats://…", …]

@@ -11,6 +11,7 @@
 #include "tests/receiver/Load.h"
 #include "tests/receiver/ReceiverTest.h"
 #include "tests/support/ChildProcess.h"
+#include "tools/demo/Ports.h"
 
 namespace kyt::receiver {
 namespace {
@@ -111,7 +112,7 @@ TEST_F(ReceiverInTrouble, KilledBetweenPublicationAndAnswerARepeatIsStoredOnce) 
 
 TEST_F(ReceiverInTrouble, KilledUnderLoadNoAnsweredPostIsLostAndNoneIsStoredTwice) {
   ReceiverProcess::Options options;
-  options.port = freePort();
+  options.port = tools::freePort();
   start(options);
   Load load({{receiver_->port()}});
   for (uint64_t times = 1; times <= 3; ++times) {
@@ -130,7 +131,7 @@ TEST_F(ReceiverInTrouble, KilledUnderLoadNoAnsweredPostIsLostAndNoneIsStoredTwic
 
 TEST_F(ReceiverInTrouble, ToldToEndUnderLoadItLosesNoAnsweredPost) {
   ReceiverProcess::Options options;
-  options.port = freePort();
+  options.port = tools::freePort();
   const TemporaryFolder folder;
   options.spool = folder / "spool";
   start(options);

@@ -14,6 +14,7 @@
 #include "tools/StorebagFile.h"
 #include "tools/demo/DemoBag.h"
 #include "tools/demo/Http.h"
+#include "tools/demo/Ports.h"
 
 namespace kyt::tools {
 

@@ -1,16 +1,13 @@
 #include "tools/fleet/Front.h"
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
 
-#include "platform/linux/base/Descriptors.h"
 #include "tools/StorebagFile.h"
+#include "tools/demo/Ports.h"
 
 namespace kyt::tools {
 
@@ -21,14 +18,6 @@ constexpr std::chrono::seconds kStarts{20};
 
 Error failure(std::string text) {
   return Error{"KYTToolsErrorDomain", -1, std::move(text)};
-}
-
-sockaddr_in loopback(uint16_t port) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  address.sin_port = htons(port);
-  return address;
 }
 
 std::string nginxProgram() {
@@ -85,22 +74,6 @@ std::vector<std::string> argumentsOf(const FrontOptions& options) {
 }
 
 }  // namespace
-
-uint16_t freePort() {
-  const Descriptor listening = ownDescriptor(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_in address = loopback(0);
-  socklen_t size = sizeof address;
-  if (bind(listening.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-      getsockname(listening.get(), reinterpret_cast<sockaddr*>(&address), &size) != 0)
-    return 0;
-  return ntohs(address.sin_port);
-}
-
-bool takesConnections(uint16_t port) {
-  const Descriptor client = ownDescriptor(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  const sockaddr_in address = loopback(port);
-  return connect(client.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-}
 
 std::variant<Front, Error> Front::start(const FrontOptions& options) {
   std::string said;

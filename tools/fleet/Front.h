@@ -36,9 +36,4 @@ class Front {
   uint16_t port_ = 0;
 };
 
-// A port of the loopback that nobody has at this moment.
-[[nodiscard]] uint16_t freePort();
-// Whether somebody takes connections there.
-[[nodiscard]] bool takesConnections(uint16_t port);
-
 }  // namespace kyt::tools
