@@ -32,13 +32,15 @@ class Administration::Window final : public AdministrationInterface {
       : all_(all), mayLook_(mayLook), ownsDaemon_(ownsDaemon), queue_(std::move(queue)) {}
   [[nodiscard]] const char* refusal() const override { return mayLook_ ? nullptr : all_.refusal_.c_str(); }
   [[nodiscard]] Dictionary status() override { return all_.status(); }
-  [[nodiscard]] std::vector<Dictionary> sessions() override { return all_.sessions(); }
-  [[nodiscard]] std::vector<Dictionary> books() override { return all_.books(); }
+  [[nodiscard]] std::vector<Dictionary> sessions(size_t most) override { return all_.sessions(most); }
+  [[nodiscard]] std::vector<Dictionary> books(size_t mostRowsOfUser) override {
+    return all_.books(mostRowsOfUser);
+  }
   [[nodiscard]] std::vector<Dictionary> storebags() override { return all_.storebags(); }
   [[nodiscard]] std::optional<Dictionary> storebag(std::string_view name) override {
     return all_.storebag(name);
   }
-  [[nodiscard]] std::string metrics() override { return all_.metrics(); }
+  [[nodiscard]] std::string metrics(size_t mostRowsOfUser) override { return all_.metrics(mostRowsOfUser); }
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) override {
     return all_.setLogLevel(level);
   }

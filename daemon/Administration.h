@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/Limits.h"
 #include "platform/base/ServerRecords.h"
 #include "platform/base/Watchers.h"
 #include "platform/ipc/AdministrationInterface.h"
@@ -73,12 +74,12 @@ class Administration final : public ListenerDelegate {
 
   // What the window shows, by the interface's description.
   [[nodiscard]] Dictionary status() const;
-  [[nodiscard]] std::vector<Dictionary> sessions() const;
-  [[nodiscard]] std::vector<Dictionary> books() const;
+  [[nodiscard]] std::vector<Dictionary> sessions(size_t most = Limits::maxShownSessions) const;
+  [[nodiscard]] std::vector<Dictionary> books(size_t mostRowsOfUser = Limits::maxBookRows) const;
   [[nodiscard]] std::vector<Dictionary> storebags() const;
   // None where no storebag of that name is in force.
   [[nodiscard]] std::optional<Dictionary> storebag(std::string_view name) const;
-  [[nodiscard]] std::string metrics() const;
+  [[nodiscard]] std::string metrics(size_t mostRowsOfUser = Limits::maxBookRows) const;
   [[nodiscard]] std::optional<std::string> setLogLevel(std::string_view level) const;
   [[nodiscard]] bool hasOutbox() const { return sources_.outbox.view != nullptr; }
   [[nodiscard]] const OutboxOperations& outbox() const { return sources_.outbox; }

@@ -8,6 +8,7 @@
 #include "daemon/Administration.h"
 #include "daemon/StorebagStandings.h"
 #include "platform/Platform.h"
+#include "platform/base/BookRows.h"
 #include "platform/base/Books.h"
 #include "platform/base/Clock.h"
 #include "platform/base/Limits.h"
@@ -210,10 +211,10 @@ Dictionary Administration::status() const {
   return status;
 }
 
-std::vector<Dictionary> Administration::sessions() const {
+std::vector<Dictionary> Administration::sessions(size_t most) const {
   std::map<int32_t, std::string> programs;
   std::vector<Dictionary> views;
-  for (const SessionView& session : sources_.sessions.views(Limits::maxShownSessions)) {
+  for (const SessionView& session : sources_.sessions.views(most)) {
     if (session.process > 0 && programs.size() < kMostPrograms && programs.count(session.process) == 0)
       programs.emplace(session.process, sources_.programOf(session.process));
     const auto program = programs.find(session.process);
@@ -222,9 +223,10 @@ std::vector<Dictionary> Administration::sessions() const {
   return views;
 }
 
-std::vector<Dictionary> Administration::books() const {
+std::vector<Dictionary> Administration::books(size_t mostRowsOfUser) const {
   std::vector<Dictionary> rows;
-  for (const BookRow& row : sources_.platform.books.snapshot()) rows.push_back(bookView(row));
+  for (const BookRow& row : withFewerRows(sources_.platform.books.snapshot(), mostRowsOfUser))
+    rows.push_back(bookView(row));
   return rows;
 }
 

@@ -1,16 +1,19 @@
 // The figures of the window in the OpenMetrics text format, version 1.0. Labels have few values: programs are the books'
 // rows, whose number and names have limits, and servers are those that are remembered.
-#include <charconv>
+#include <algorithm>
 #include <initializer_list>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <utility>
+#include <vector>
 
 #include "config/ClientTypes.h"
 #include "daemon/Administration.h"
 #include "daemon/StorebagStandings.h"
 #include "platform/Platform.h"
 #include "platform/URLSession.h"
+#include "platform/base/BookRows.h"
 #include "platform/base/Books.h"
 #include "platform/base/Counters.h"
 #include "platform/base/TextEscape.h"
@@ -22,23 +25,38 @@ namespace {
 
 using Labels = std::initializer_list<std::pair<const char*, std::string>>;
 
-void appendQuoted(std::string& value, std::string_view text) {
-  for (const char c : escapedText(text)) {
-    if (c == '"' || c == '\\') value += '\\';
-    value += c;
+// Bytes of a label's value that a client chose, since it stands in many samples of a row.
+constexpr size_t kMostChosenBytes = 64;
+
+// Text in one line of valid UTF-8, as a label's value is written: no two texts alike, but those that are cut, which end in
+// what no other ends in.
+std::string labelValue(std::string_view text, size_t most) {
+  std::string value;
+  while (!text.empty()) {
+    const size_t length = std::max<size_t>(utf8SequenceLength(text), 1);
+    const size_t before = value.size();
+    for (const char c : escapedName(text.substr(0, length))) {
+      if (c == '"' || c == '\\') value += '\\';
+      value += c;
+    }
+    if (value.size() > most) {
+      value.resize(before);
+      return value += "\\\\...";
+    }
+    text.remove_prefix(length);
   }
+  return value;
 }
 
-// Text in one line of valid UTF-8, as a label's value is written. A backslash of its own is written as its number, so that
-// no two texts are written alike: a sample that stood twice would have all of them refused.
-std::string labelValue(std::string_view text) {
-  std::string value;
-  for (size_t next = 0; (next = text.find('\\')) != text.npos; text.remove_prefix(next + 1)) {
-    appendQuoted(value, text.substr(0, next));
-    value += "\\\\x5c";
-  }
-  appendQuoted(value, text);
-  return value;
+std::string written(Labels labels, size_t mostBytes = SIZE_MAX) {
+  std::string text;
+  for (const auto& [name, value] : labels)
+    text.append(text.empty() ? "" : ",")
+        .append(name)
+        .append("=\"")
+        .append(labelValue(value, mostBytes))
+        .append("\"");
+  return text;
 }
 
 class MetricsText {
@@ -52,15 +70,17 @@ class MetricsText {
     text_.append("# TYPE ").append(name_).append(isCounter_ ? " counter\n" : " gauge\n");
     if (!unit.empty()) text_.append("# UNIT ").append(name_).append(" ").append(unit).append("\n");
   }
-  void sample(uint64_t number, Labels labels = {}) {
+  void sample(uint64_t number, Labels labels = {}) { sample(number, written(labels)); }
+  // With labels that are written already, and perhaps one more.
+  void sample(uint64_t number, const std::string& labels, Labels more = {}) {
     text_.append(name_).append(isCounter_ ? "_total" : "");
-    char before = '{';
-    for (const auto& [name, value] : labels) {
-      text_ += before;
-      text_.append(name).append("=\"").append(labelValue(value)).append("\"");
-      before = ',';
-    }
-    if (before == ',') text_ += '}';
+    const std::string last = written(more);
+    if (!labels.empty() || !last.empty())
+      text_.append("{")
+          .append(labels)
+          .append(labels.empty() || last.empty() ? "" : ",")
+          .append(last)
+          .append("}");
     text_.append(" ").append(std::to_string(number)).append("\n");
   }
   [[nodiscard]] std::string finish() && { return std::move(text_.append("# EOF\n")); }
@@ -82,40 +102,49 @@ constexpr Place kPlaces[] = {{"queued", &BookRow::queued},
                              {"waiting", &BookRow::waiting},
                              {"outbox", &BookRow::outbox}};
 
-// One sample of a row; `more` is a label of its own.
-void rowSample(MetricsText& out, const BookRow& row, uint64_t number, const char* more = nullptr,
-               const char* value = "") {
-  const std::string user = std::to_string(row.program.user), type = std::to_string(row.program.clientType);
-  const char* origin = row.isInternal ? "daemon" : "program";
-  if (more == nullptr)
-    out.sample(number, {{"user", user},
-                        {"client_type", type},
-                        {"client", row.program.clientName},
-                        {"service", row.program.service},
-                        {"back_end", row.backEnd},
-                        {"origin", origin}});
-  else
-    out.sample(number, {{"user", user},
-                        {"client_type", type},
-                        {"client", row.program.clientName},
-                        {"service", row.program.service},
-                        {"back_end", row.backEnd},
-                        {"origin", origin},
-                        {more, value}});
+struct LabelledRow {
+  std::string labels;
+  BookRow figures;
+};
+
+// Rows whose labels are alike, since their names are cut, are added up: a sample that stood twice would have all of them
+// refused.
+std::vector<LabelledRow> labelled(const std::vector<BookRow>& rows) {
+  std::vector<LabelledRow> all;
+  std::unordered_map<std::string, size_t> places;
+  for (const BookRow& row : rows) {
+    std::string labels = written({{"user", std::to_string(row.program.user)},
+                                  {"client_type", std::to_string(row.program.clientType)},
+                                  {"client", row.program.clientName},
+                                  {"service", row.program.service},
+                                  {"back_end", row.backEnd},
+                                  {"origin", row.isInternal ? "daemon" : "program"}},
+                                 kMostChosenBytes);
+    const auto [place, isNew] = places.try_emplace(labels, all.size());
+    if (isNew)
+      all.push_back({std::move(labels), row});
+    else
+      addFigures(all[place->second].figures, row);
+  }
+  return all;
 }
 
-void writeBooks(MetricsText& out, const std::vector<BookRow>& rows) {
+void writeBooks(MetricsText& out, const std::vector<LabelledRow>& rows) {
   out.metric("events_taken", Kind::counter, "", "Events that were taken, once for each back end.");
-  for (const BookRow& row : rows) rowSample(out, row, row.taken);
+  for (const auto& [labels, row] : rows) out.sample(row.taken, labels);
   out.metric("events_delivered", Kind::counter, "", "Events that a server has answered with no error.");
-  for (const BookRow& row : rows) rowSample(out, row, row.delivered);
+  for (const auto& [labels, row] : rows) out.sample(row.delivered, labels);
   out.metric("events_dropped", Kind::counter, "", "Events that were lost or left out, by reason.");
-  for (const BookRow& row : rows)
+  for (const auto& [labels, row] : rows)
     for (size_t i = 0; i < kFates.size(); ++i)
-      if (row.dropped.at(i) != 0) rowSample(out, row, row.dropped.at(i), "reason", reasonName(kFates.at(i)));
+      if (row.dropped.at(i) != 0)
+        out.sample(row.dropped.at(i), labels, {{"reason", reasonName(kFates.at(i))}});
   out.metric("events_pending", Kind::gauge, "", "Events that wait, by place.");
-  for (const BookRow& row : rows)
-    for (const Place& place : kPlaces) rowSample(out, row, row.*place.number, "place", place.name);
+  for (const auto& [labels, row] : rows)
+    for (const Place& place : kPlaces) out.sample(row.*place.number, labels, {{"place", place.name}});
+  out.metric("programs_merged", Kind::gauge, "", "Programs, at least, that share a row with others.");
+  for (const auto& [labels, row] : rows)
+    if (row.programsMerged != 0) out.sample(row.programsMerged, labels);
 }
 
 void writeCounters(MetricsText& out, const Counters& counters) {
@@ -157,7 +186,7 @@ void writeStorebags(MetricsText& out, const std::vector<StorebagView>& storebags
 
 }  // namespace
 
-std::string Administration::metrics() const {
+std::string Administration::metrics(size_t mostRowsOfUser) const {
   const Platform& platform = sources_.platform;
   const ProcessFigures process = sources_.process();
   uint64_t sessions = 0;
@@ -177,7 +206,7 @@ std::string Administration::metrics() const {
   out.sample(sources_.connections());
   out.metric("sessions", Kind::gauge, "", "Sessions that live.");
   out.sample(sessions);
-  writeBooks(out, platform.books.snapshot());
+  writeBooks(out, labelled(withFewerRows(platform.books.snapshot(), mostRowsOfUser)));
   writeCounters(out, platform.counters);
   writeRequests(out, platform.urlSessions.figures(), sources_.servers.all());
   writeStorebags(out, sources_.storebags.views());

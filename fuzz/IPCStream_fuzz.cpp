@@ -58,13 +58,13 @@ class EmptyWindow final : public AdministrationInterface {
  public:
   const char* refusal() const override { return nullptr; }
   Dictionary status() override { return {{"pid", 1}}; }
-  std::vector<Dictionary> sessions() override { return {{{"user", 1}}, {}}; }
-  std::vector<Dictionary> books() override { return {}; }
+  std::vector<Dictionary> sessions(size_t /*most*/) override { return {{{"user", 1}}, {}}; }
+  std::vector<Dictionary> books(size_t /*mostRowsOfUser*/) override { return {}; }
   std::vector<Dictionary> storebags() override { return {}; }
   std::optional<Dictionary> storebag(std::string_view name) override {
     return name.empty() ? std::nullopt : std::optional(Dictionary{{"name", name}});
   }
-  std::string metrics() override { return "# EOF\n"; }
+  std::string metrics(size_t /*mostRowsOfUser*/) override { return "# EOF\n"; }
   std::optional<std::string> setLogLevel(std::string_view level) override { return std::string(level); }
   std::optional<std::string> reload(std::vector<std::string>& /*lines*/) override { return std::nullopt; }
   std::vector<Dictionary> outbox() override { return {{{"server", "https://example.org"}}}; }

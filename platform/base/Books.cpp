@@ -26,10 +26,10 @@ uint64_t read(const Number& number) {
   return number.load(std::memory_order_acquire);
 }
 
-constexpr std::string_view kOther = "other";
-constexpr uint32_t kAllUsers = ~uint32_t{0};
-// Programs without rows that are told from each other.
-constexpr size_t kMostMerged = 4096;
+// Programs without rows that are told from each other: of each row "other", and further ones of all together, so that no
+// user's programs keep those of others from being counted.
+constexpr size_t kMostMergedOfRow = 64;
+constexpr size_t kMostMergedBesides = 4096;
 
 size_t hashOf(const ReportingProgram& program) {
   const std::string text = std::to_string(program.user) + '/' + std::to_string(program.clientType) + '/' +
@@ -54,6 +54,7 @@ struct Books::Row {
   Tally* first = nullptr;
   uint64_t taken = 0, batched = 0;  // of tallies that are gone
   uint64_t programsMerged = 0;
+  std::unordered_set<size_t> merged;  // their hashes
   const BookRowName* name = nullptr;  // constant
 
   void fill(BookRow& row) const;
@@ -70,10 +71,11 @@ struct Books::State {
   std::map<Key, Row> rows GUARDED_BY(mutex);
   std::map<uint32_t, size_t> rowsOfUser GUARDED_BY(mutex);
   size_t rowsOfPrograms GUARDED_BY(mutex) = 0;
-  std::unordered_set<size_t> merged GUARDED_BY(mutex);  // hashes
+  size_t mergedBesides GUARDED_BY(mutex) = 0;
 
   Row& row(Key key) REQUIRES(mutex);
-  Row& otherRow(const ReportingProgram& program) REQUIRES(mutex);
+  Row& otherRow(uint32_t user, bool isInternal) REQUIRES(mutex);
+  void countMerged(Row& row, const ReportingProgram& program) REQUIRES(mutex);
 };
 
 // What leaves is read before what came, and each place before the one before it on an event's road: so the events of a row
@@ -105,7 +107,11 @@ Books::Row& Books::State::row(Key key) {
   size_t& ofUser = rowsOfUser[key.program.user];
   const bool hasRoom =
       rowsOfPrograms < Limits::maxBookRows - Limits::bookRowsForOthers && ofUser < Limits::maxBookRowsOfUser;
-  if (!hasRoom) return otherRow(key.program);
+  if (!hasRoom) {
+    Row& other = otherRow(key.program.user, key.isInternal);
+    countMerged(other, key.program);
+    return other;
+  }
   ++rowsOfPrograms;
   ++ofUser;
   const bool isInternal = key.isInternal;
@@ -115,20 +121,28 @@ Books::Row& Books::State::row(Key key) {
   return made->second;
 }
 
-Books::Row& Books::State::otherRow(const ReportingProgram& program) {
-  const auto keyOf = [](uint32_t user) {
-    return Key{{user, 0, std::string(kOther), ""}, std::string(kOther), false, true};
+Books::Row& Books::State::otherRow(uint32_t user, bool isInternal) {
+  const auto keyOf = [isInternal](uint32_t whose) {
+    return Key{{whose, 0, std::string(kOtherPrograms), ""}, std::string(kOtherPrograms), isInternal, true};
   };
-  auto found = rows.find(keyOf(program.user));
+  auto found = rows.find(keyOf(user));
   if (found == rows.end()) {
-    // The last one is for all users that come after.
-    const bool isLast = rows.size() - rowsOfPrograms + 1 >= Limits::bookRowsForOthers;
-    found = rows.try_emplace(keyOf(isLast ? kAllUsers : program.user)).first;
+    // The last two are for all users that come after.
+    const bool isLast = rows.size() - rowsOfPrograms + 2 >= Limits::bookRowsForOthers;
+    found = rows.try_emplace(keyOf(isLast ? kAllUsers : user)).first;
     found->second.name = &found->first;
+    found->second.isInternal = isInternal;
+    found->second.programsMerged = 1;
   }
-  if (merged.size() < kMostMerged && merged.insert(hashOf(program)).second) ++found->second.programsMerged;
-  found->second.programsMerged = std::max<uint64_t>(found->second.programsMerged, 1);
   return found->second;
+}
+
+void Books::State::countMerged(Row& row, const ReportingProgram& program) {
+  const bool isBesides = row.merged.size() >= kMostMergedOfRow;
+  if (isBesides && mergedBesides >= kMostMergedBesides) return;
+  if (!row.merged.insert(hashOf(program)).second) return;
+  if (isBesides) ++mergedBesides;
+  row.programsMerged = row.merged.size();
 }
 
 Books::Books() : state_(std::make_shared<State>(nullptr)) {}
@@ -149,7 +163,7 @@ std::shared_ptr<Tally> Books::open(const ReportingProgram& program, std::string_
 std::shared_ptr<Tally> Books::reopen(BookRowName name) {
   const ReportingProgram program = name.program;
   MutexLock lock(state_->mutex);
-  Row& row = name.isOther ? state_->otherRow(program) : state_->row(std::move(name));
+  Row& row = name.isOther ? state_->otherRow(program.user, name.isInternal) : state_->row(std::move(name));
   return std::make_shared<Tally>(state_, row, program);
 }
 
@@ -405,7 +419,7 @@ uint64_t BookRow::droppedInAll() const {
 std::string describeRow(const BookRow& row) {
   const auto name = [](const std::string& text) {
     std::string shown = "\"";
-    for (const char c : escapedText(text)) {
+    for (const char c : escapedName(text)) {
       if (c == '"') shown += '\\';
       shown += c;
     }

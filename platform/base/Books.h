@@ -33,6 +33,11 @@ namespace kyt {
 // The back end of events that none took.
 inline constexpr std::string_view kNoBackEnd = "-";
 
+// The program and back end of the rows for programs that had no room for rows of their own, and the user of the one for all
+// users who came after.
+inline constexpr std::string_view kOtherPrograms = "other";
+inline constexpr uint32_t kAllUsers = ~uint32_t{0};
+
 // What names a row, for who keeps events longer than the process lives.
 struct BookRowName {
   ReportingProgram program;
@@ -53,7 +58,7 @@ struct BookRow {
   uint64_t outbox = 0;    // in a post that is kept on disk, to be sent again
   uint64_t delivered = 0;
   std::array<uint64_t, kFates.size()> dropped{};
-  // Not 0: this is the row "other" of a user, of so many programs (at least) that had no room for rows of their own.
+  // Not 0: this is a row "other" of a user, of so many programs (at least) that had no room for rows of their own.
   uint64_t programsMerged = 0;
 
   [[nodiscard]] uint64_t pending() const { return queued + batched + inFlight + waiting + outbox; }
@@ -76,7 +81,7 @@ class Books {
   Books& operator=(const Books&) = delete;
 
   // A tally of that row, which is made where there is none and there is room (Limits::maxBookRows); further programs
-  // share the row "other" of their user. Names are cut to Limits::maxBookNameBytes. Takes a lock.
+  // share the row "other" of their user, and the daemon's own messages of their sessions another one. Names are cut to Limits::maxBookNameBytes. Takes a lock.
   [[nodiscard]] std::shared_ptr<Tally> open(const ReportingProgram& program, std::string_view backEnd,
                                             bool isInternal);
   // The same by a name that a tally had, perhaps in an earlier process.

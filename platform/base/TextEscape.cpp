@@ -103,6 +103,16 @@ std::string escapedText(std::string_view text) {
   return out;
 }
 
+std::string escapedName(std::string_view name) {
+  std::string out;
+  for (size_t next = 0; (next = name.find('\\')) != name.npos; name.remove_prefix(next + 1)) {
+    appendEscaped(out, name.substr(0, next));
+    out += "\\x5c";
+  }
+  appendEscaped(out, name);
+  return out;
+}
+
 void appendEscapedLines(std::string& out, std::string_view text) {
   for (;;) {
     const size_t end = text.find('\n');

@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/base/Counters.h"
+#include "platform/base/Limits.h"
 #include "platform/ipc/AdministrationInterface.h"
 #include "platform/ipc/BodyReader.h"
 #include "platform/ipc/BodyValidator.h"
@@ -22,23 +23,62 @@ struct Call {
 
 using Handler = void (*)(const Call&, std::string_view replySignature);
 
+// What is told in detail, or in less where that does not fit what may wait for the peer.
+constexpr size_t kSessionsShown[] = {Limits::maxShownSessions, 256, 32, 4};
+constexpr size_t kRowsOfUser[] = {Limits::maxBookRows, 64, 8, 1, 0};
+
+void sayItDoesNotFit(const Call& call) {
+  call.reply.error(wire::kErrorLimitsExceeded,
+                   "The answer is larger than what may wait for one client (limits.max_queued_bytes, "
+                   "limits.max_bytes_per_user)");
+}
+
+// `write(MessageWriter&)` writes the body.
+template <typename Write>
+void answer(const Call& call, std::string_view signature, Write write) {
+  if (!call.reply.answerIfItFits(signature, write)) sayItDoesNotFit(call);
+}
+
 void status(const Call& call, std::string_view signature) {
   if (call.in.finish() != BodyStatus::ok) return;
-  const Dictionary answer = call.window.status();
-  call.reply.answer(signature, [&](MessageWriter& out) { out.writeDictionary(answer); });
+  const Dictionary status = call.window.status();
+  answer(call, signature, [&](MessageWriter& out) { out.writeDictionary(status); });
+}
+
+void sessions(const Call& call, std::string_view signature) {
+  if (call.in.finish() != BodyStatus::ok) return;
+  for (const size_t most : kSessionsShown) {
+    const std::vector<Dictionary> shown = call.window.sessions(most);
+    if (call.reply.answerIfItFits(signature, [&](MessageWriter& out) { out.writeDictionaries(shown); }))
+      return;
+  }
+  sayItDoesNotFit(call);
+}
+
+void books(const Call& call, std::string_view signature) {
+  if (call.in.finish() != BodyStatus::ok) return;
+  for (const size_t most : kRowsOfUser) {
+    const std::vector<Dictionary> rows = call.window.books(most);
+    if (call.reply.answerIfItFits(signature, [&](MessageWriter& out) { out.writeDictionaries(rows); }))
+      return;
+  }
+  sayItDoesNotFit(call);
 }
 
 template <std::vector<Dictionary> (AdministrationInterface::*list)()>
 void dictionaries(const Call& call, std::string_view signature) {
   if (call.in.finish() != BodyStatus::ok) return;
-  const std::vector<Dictionary> answer = (call.window.*list)();
-  call.reply.answer(signature, [&](MessageWriter& out) { out.writeDictionaries(answer); });
+  const std::vector<Dictionary> all = (call.window.*list)();
+  answer(call, signature, [&](MessageWriter& out) { out.writeDictionaries(all); });
 }
 
 void metrics(const Call& call, std::string_view signature) {
   if (call.in.finish() != BodyStatus::ok) return;
-  const std::string answer = call.window.metrics();
-  call.reply.answer(signature, [&](MessageWriter& out) { out.writeString(answer); });
+  for (const size_t most : kRowsOfUser) {
+    const std::string text = call.window.metrics(most);
+    if (call.reply.answerIfItFits(signature, [&](MessageWriter& out) { out.writeString(text); })) return;
+  }
+  sayItDoesNotFit(call);
 }
 
 void setLogLevel(const Call& call, std::string_view /*signature*/) {
@@ -103,8 +143,8 @@ void storebag(const Call& call, std::string_view signature) {
   std::string_view name;
   call.in.readStringView(name);
   if (call.in.finish() != BodyStatus::ok) return;
-  if (const auto answer = call.window.storebag(name))
-    call.reply.answer(signature, [&](MessageWriter& out) { out.writeDictionary(*answer); });
+  if (const auto bag = call.window.storebag(name))
+    answer(call, signature, [&](MessageWriter& out) { out.writeDictionary(*bag); });
   else
     call.reply.error(wire::kErrorFailed, "no storebag of that name is in force");
 }
@@ -130,18 +170,8 @@ void dropOutbox(const Call& call, std::string_view signature) {
 
 // Each at the place of its row in kAdministrationMethods.
 constexpr std::array<Handler, kAdministrationMethods.size()> kHandlers{
-    status,
-    dictionaries<&AdministrationInterface::sessions>,
-    dictionaries<&AdministrationInterface::books>,
-    dictionaries<&AdministrationInterface::storebags>,
-    metrics,
-    setLogLevel,
-    reload,
-    watch,
-    storebag,
-    dictionaries<&AdministrationInterface::outbox>,
-    flushOutbox,
-    dropOutbox,
+    status, sessions, books,    dictionaries<&AdministrationInterface::storebags>, metrics,     setLogLevel,
+    reload, watch,    storebag, dictionaries<&AdministrationInterface::outbox>,    flushOutbox, dropOutbox,
 };
 
 size_t numberOf(std::string_view member) {

@@ -6,6 +6,7 @@
 // session shows is published by it.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -33,12 +34,14 @@ class AdministrationInterface : public ExportedObject {
   [[nodiscard]] virtual const char* refusal() const = 0;
 
   [[nodiscard]] virtual Dictionary status() = 0;
-  [[nodiscard]] virtual std::vector<Dictionary> sessions() = 0;
-  [[nodiscard]] virtual std::vector<Dictionary> books() = 0;
+  // The oldest, so many at most.
+  [[nodiscard]] virtual std::vector<Dictionary> sessions(size_t most) = 0;
+  // A user who has more rows than so many has one, which adds up all; with 0 all users share one.
+  [[nodiscard]] virtual std::vector<Dictionary> books(size_t mostRowsOfUser) = 0;
   [[nodiscard]] virtual std::vector<Dictionary> storebags() = 0;
   // None where no storebag of that name is in force.
   [[nodiscard]] virtual std::optional<Dictionary> storebag(std::string_view name) = 0;
-  [[nodiscard]] virtual std::string metrics() = 0;
+  [[nodiscard]] virtual std::string metrics(size_t mostRowsOfUser) = 0;  // as of books()
   // "debug", "default" or "error", until the daemon ends. What is wrong with it, or none.
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;
   // From now on the peer is told of events as they pass, by the signal, on the connection's queue, until its end. Another call

@@ -37,6 +37,22 @@ class CallReply {
       sendError(*output, wire::kErrorFailed, "The answer is too large for a message");
     }
   }
+  // The same for an answer that may be larger than what may wait for the client: where it is, nothing is answered yet, and
+  // false is returned.
+  template <typename Body>
+  [[nodiscard]] bool answerIfItFits(std::string_view signature, Body&& body) {
+    if (!output_) return true;
+    const auto sent = output_->send(
+        [&](MessageWriter& writer, uint32_t serial) {
+          writer.beginReply(serial, serial_, signature);
+          body(writer);
+          return writer.end();
+        },
+        ConnectionOutput::Kind::bounded);
+    if (sent == ConnectionOutput::Sent::refused || sent == ConnectionOutput::Sent::queueFull) return false;
+    output_.reset();
+    return true;
+  }
   void answerNothing() {
     answer({}, [](MessageWriter&) {});
   }

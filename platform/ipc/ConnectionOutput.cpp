@@ -29,6 +29,10 @@ ConnectionOutput::Sent ConnectionOutput::send(Builder build, Kind kind) {
       countWaiting();
       return Sent::queueFull;
     }
+    if (kind == Kind::bounded && wouldEnd(queue.size() - before)) {
+      queue.resize(before);
+      return Sent::queueFull;
+    }
     news = queued(kind);
   }
   tell(news);
@@ -71,6 +75,16 @@ ConnectionOutput::News ConnectionOutput::queued(Kind kind) {
   }
   news.paused = !news.broken && left > maxQueuedBytes_ && !paused_.exchange(true);
   return news;
+}
+
+// A socket without anything in it takes what is small: only of what is larger some waits, and is counted.
+bool ConnectionOutput::wouldEnd(size_t lastMessageBytes) {
+  if (waitingBytes() > 2 * maxQueuedBytes_) return true;
+  if (account_ == nullptr || (!waiting_ && lastMessageBytes <= kMostHeldBytes)) return false;
+  charge_.setAnyway(waitingBytes() + Limits::socketBytes);
+  const bool isOver = account_->isOver(Share::bytes);
+  countWaiting();
+  return isOver;
 }
 
 // While the socket takes what is written, little waits, and not for long: that is counted with the connection.

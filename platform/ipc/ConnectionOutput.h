@@ -47,6 +47,7 @@ class ConnectionOutput {
   enum class Kind : uint8_t {
     ordinary,
     droppable,  // not sent where it would pass the limit
+    bounded,    // not sent where it would end the connection, so that its caller can say so instead
     optional,  // not sent while anything waits for the socket: a client that does not read costs one such message
     vital,  // sent past every limit, and never the reason why the connection ends: the caller sees to it that
             // such messages are few
@@ -54,9 +55,10 @@ class ConnectionOutput {
   using Builder = Function<bool(MessageWriter&, uint32_t serial)>;
   enum class Sent : uint8_t {
     yes,
-    closed,     // nobody is there any more
-    refused,    // it cannot be written as a message: too long, or nested too deeply
-    queueFull,  // it is droppable and would have passed the limit, or optional and would have had to wait
+    closed,   // nobody is there any more
+    refused,  // it cannot be written as a message: too long, or nested too deeply
+    queueFull,  // it is droppable and would have passed the limit, bounded and the end of the connection, or optional and
+                // would have had to wait
   };
   // Writes one whole message.
   Sent send(Builder build, Kind kind = Kind::ordinary);
@@ -91,6 +93,8 @@ class ConnectionOutput {
   [[nodiscard]] bool fillsItsUsersShare() const REQUIRES(mutex_) {
     return waiting_ && account_ != nullptr && account_->isOver(Share::bytes);
   }
+  // Whether what waits now would end the connection if the socket took nothing of the last message.
+  [[nodiscard]] bool wouldEnd(size_t lastMessageBytes) REQUIRES(mutex_);
   void discard() REQUIRES(mutex_);
   void tell(const News& news);
 

@@ -205,6 +205,59 @@ TEST_F(AdministrationTest, AddsUpTheBooksOfAllPrograms) {
   EXPECT_EQ(rows[0].dictionary("droppedBy")->integer("not-configured"), 1);
 }
 
+// As many rows as there may be, with the names that become longest, and some losses of each.
+TEST_F(AdministrationTest, WritesFiguresOfTheLongestNamesThatOneReplyHolds) {
+  std::vector<std::shared_ptr<Tally>> tallies;
+  const std::string name(Limits::maxBookNameBytes, '\x01');
+  for (uint32_t i = 0; i < Limits::maxBookRows; ++i) {
+    const std::string number = std::to_string(i);
+    std::string client = name;
+    client.replace(0, number.size(), number);
+    tallies.push_back(test_.books.open({i % 3, 1000000007, client, name}, name, false));
+    for (const Reason fate : {Reason::notConfigured, Reason::noBackEnds, Reason::postFailed}) {
+      tallies.back()->take();
+      tallies.back()->drop(fate, 1);
+    }
+  }
+  ASSERT_GT(administration_.books().size(), 2 * Limits::maxBookRowsOfUser);
+  EXPECT_LT(administration_.metrics().size(), Limits().maxQueuedBytes);
+}
+
+TEST_F(AdministrationTest, WritesNoSampleTwiceWhereNamesAreCut) {
+  const std::string beginning(64, 'a');
+  std::vector<std::shared_ptr<Tally>> tallies;
+  for (const char* end : {"", "\\", "\\...", "...", "1 and more", "2 and more", "\n and more"}) {
+    tallies.push_back(test_.books.open({1000, 7, beginning + end, "s"}, "-", false));
+    tallies.back()->take();
+  }
+  const std::string text = administration_.metrics();
+  std::map<std::string, int> taken;
+  int64_t sum = 0;
+  for (size_t at = 0; (at = text.find("\nkytreportingd_events_taken_total{", at)) != text.npos; ++at) {
+    const std::string line = text.substr(at + 1, text.find('\n', at + 1) - at - 1);
+    const size_t space = line.rfind(' ');
+    EXPECT_EQ(++taken[line.substr(0, space)], 1) << line;
+    sum += std::stoll(line.substr(space + 1));
+  }
+  EXPECT_EQ(sum, 7);
+  EXPECT_EQ(taken.size(), 2U) << "one that is whole, and one of all that are cut";
+}
+
+TEST_F(AdministrationTest, TellsInTheFiguresHowManyProgramsShareARow) {
+  std::vector<std::shared_ptr<Tally>> tallies;
+  for (size_t i = 0; i < Limits::maxBookRowsOfUser + 5; ++i)
+    tallies.push_back(test_.books.open({1000, 7, std::to_string(i), "s"}, "-", false));
+  EXPECT_NE(
+      administration_.metrics().find(
+          "\nkytreportingd_programs_merged{user=\"1000\",client_type=\"0\",client=\"other\",service=\"\","
+          "back_end=\"other\",origin=\"program\"} 5\n"),
+      std::string::npos);
+  EXPECT_NE(administration_.metrics(1).find("\nkytreportingd_programs_merged{user=\"1000\",client_type=\"0\","
+                                            "client=\"other\",service=\"\",back_end=\"other\",origin="
+                                            "\"program\"} 453\n"),
+            std::string::npos);
+}
+
 TEST_F(AdministrationTest, SetsTheLogLevel) {
   EXPECT_EQ(administration_.setLogLevel("error"), std::nullopt);
   EXPECT_FALSE(test_.log.enabled(LogLevel::normal));

@@ -196,6 +196,34 @@ TEST_F(KytctlWindow, IsNotConfusedByNamesOfAnyKind) {
   EXPECT_EQ(metrics.find("# EOF\n"), metrics.size() - 6);
 }
 
+TEST_F(KytctlWindow, WritesNoTwoProgramsAlike) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  const std::string beginning = "com.vantu.programs.that.begin.alike.";
+  for (const std::string& name : {std::string("a\n"), std::string("a\\n"), std::string("a:test"),
+                                  beginning + "one", beginning + "another"}) {
+    TestClient client(socket(), 7, name);
+    EXPECT_EQ(client.configure(), "live:");
+    EXPECT_TRUE(client.send(5, 1, {}));
+    EXPECT_EQ(client.displayURL(), "https://display.example.org/");
+  }
+  const std::string books = columns({"books"});
+  for (const char* wanted : {" a\\n:test ", " a\\x5cn:test ", " a\\x3atest:test ",
+                             "\n      com.vantu.programs.that.begin.alike.one:test\n",
+                             "\n      com.vantu.programs.that.begin.alike.another:test\n"})
+    EXPECT_NE(books.find(wanted), std::string::npos) << wanted << "\n" << books;
+}
+
+TEST_F(KytctlWindow, TellsInTheColumnsOfTheBooksWhereEventsWait) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  TestClient client(socket(), 7, "a");
+  report(client);
+  EXPECT_NE(columns({"books"}).find("\n      pending: batched 1\n"), std::string::npos) << columns({"books"});
+}
+
 // A program may call itself anything in each message: that makes no more rows than a user may have, and none of another
 // user's program goes.
 TEST_F(KytctlWindow, ShowsBooksThatNoUserMakesGrowWithoutEnd) {
@@ -241,7 +269,80 @@ TEST_F(KytctlWindow, ShowsBooksThatNoUserMakesGrowWithoutEnd) {
   EXPECT_EQ(merged, kNames - static_cast<int64_t>(Limits::maxBookRowsOfUser));
   EXPECT_EQ(taken, kNames);
   EXPECT_TRUE(others > 0 || !isRoot);
-  static_cast<void>(columns({"books"}));
+  const std::string shown = columns({"books"});
+  EXPECT_NE(shown.find(" (other programs) "), std::string::npos) << shown;
+  EXPECT_NE(
+      shown.find("\n      of " + std::to_string(merged) + " programs, or more, without rows of their own\n"),
+      std::string::npos)
+      << shown;
+}
+
+// Where little may wait for one client, the answers tell less, and the sums stay.
+TEST_F(KytctlWindow, AnswersWhateverOneClientCallsItselfAndHoweverLittleMayWait) {
+  tools::Stage::Options options;
+  options.extraSettings = "[limits]\nmax_queued_bytes = 65536\n";
+  lay(std::move(options));
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  constexpr int kNames = 500;
+  test::PlainClient hostile(socket());
+  ASSERT_TRUE(hostile.shakeHands());
+  for (int i = 0; i < kNames; ++i)
+    hostile.call(
+        "SendMessageWithSessionInfo", "a{sv}aa{sv}qqaa{sv}",
+        [&](MessageWriter& out) {
+          out.writeDictionary({{kKYTReportingSessionInfoSessionID, 77},
+                               {kKYTReportingSessionInfoClientType, 7},
+                               {kKYTReportingSessionInfoRequireUserInfo, true}});
+          out.writeOptionalDictionary(
+              Dictionary{{"ClientName", std::to_string(i) + std::string(Limits::maxBookNameBytes, '\x01')},
+                         {"ServiceName", std::string(Limits::maxBookNameBytes, '\x01')}});
+          out.writeUInt16(5);
+          out.writeUInt16(1);
+          out.writeOptionalDictionary(std::nullopt);
+        },
+        i == kNames - 1);
+  ASSERT_TRUE(hostile.receive());
+  const std::vector<Dictionary> books = rows(json({"books"}), "rows");
+  ASSERT_EQ(books.size(), 1U);
+  EXPECT_EQ(books[0].integer("programsMerged"), kNames);
+  EXPECT_EQ(books[0].integer("taken"), kNames);
+  EXPECT_EQ(text(books[0], "client"), "other");
+  const std::string metrics = text(json({"metrics"}), "openmetrics");
+  EXPECT_NE(metrics.find("client=\"other\",service=\"\",back_end=\"other\",origin=\"program\"} 500\n"),
+            std::string::npos)
+      << metrics.substr(0, 5000);
+  EXPECT_EQ(json({"status"}).integer("taken"), kNames);
+}
+
+TEST_F(KytctlWindow, ShowsSomeOfTheSessionsWhereThereIsNoRoomForAll) {
+  tools::Stage::Options options;
+  options.extraSettings = "[limits]\nmax_queued_bytes = 32768\n";
+  lay(std::move(options));
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  std::vector<std::unique_ptr<TestClient>> clients;
+  for (int i = 0; i < 200; ++i) {
+    clients.push_back(std::make_unique<TestClient>(socket(), 7, "a"));
+    ASSERT_NE(clients.back()->configure(), "none");
+  }
+  const Dictionary answer = json({"sessions"});
+  EXPECT_EQ(answer.integer("all"), 200);
+  EXPECT_EQ(rows(answer, "sessions").size(), 32U);
+  EXPECT_NE(columns({"sessions"}).find("\nand 168 more\n"), std::string::npos);
+}
+
+TEST_F(KytctlWindow, SaysThatAnAnswerHasNoRoomAndGoesOn) {
+  tools::Stage::Options options;
+  options.extraSettings = "[limits]\nmax_queued_bytes = 2000\n";
+  lay(std::move(options));
+  startDaemon();
+  const ProgramRun run = kytctl({"metrics"});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_EQ(run.text,
+            "kytctl: The answer is larger than what may wait for one client (limits.max_queued_bytes, "
+            "limits.max_bytes_per_user)\n");
+  EXPECT_EQ(kytctl({"books"}).status, 0);
 }
 
 TEST_F(KytctlWindow, SaysThatTheDaemonDoesNotRunAndWhetherASocketWaits) {

@@ -7,6 +7,8 @@
 #include <string>
 
 #include "WireTestSupport.h"
+#include "platform/base/Limits.h"
+#include "platform/base/UserBudget.h"
 #include "platform/fake/MemoryStream.h"
 
 namespace kyt {
@@ -104,6 +106,55 @@ TEST_F(ConnectionOutputTest, EndsWithOrdinaryMessagesPastTwiceTheLimitAndNotWith
   EXPECT_EQ(send(Kind::ordinary, "b"), Sent::yes);
   EXPECT_EQ(observer_->overflowed, 1);
   EXPECT_EQ(send(Kind::optional, "c"), Sent::closed);
+}
+
+TEST_F(ConnectionOutputTest, SaysThatABoundedMessageDoesNotFitAndGoesOn) {
+  pipe_->room = 0;
+  EXPECT_EQ(send(Kind::bounded, std::string(2 * kMostQueued, 'a')), Sent::queueFull);
+  EXPECT_EQ(send(Kind::ordinary, "why not"), Sent::yes);
+  EXPECT_EQ(send(Kind::bounded, std::string(kMostQueued, 'b')), Sent::yes);
+  EXPECT_EQ(send(Kind::bounded, std::string(kMostQueued, 'c')), Sent::queueFull);
+  EXPECT_EQ(observer_->overflowed, 0);
+  pipe_->room = SIZE_MAX;
+  output_.writable();
+  EXPECT_EQ(arrived(), 2U);
+  EXPECT_EQ(send(Kind::bounded, std::string(kMostQueued, 'c')), Sent::yes);
+  EXPECT_EQ(arrived(), 3U);
+}
+
+TEST_F(ConnectionOutputTest, SaysThatABoundedMessageHasNoRoomInItsUsersShare) {
+  UserShares shares;
+  shares[Share::bytes] = 4 * Limits::socketBytes;
+  const auto account = std::make_shared<UserAccount>(1000, shares);
+  ConnectionOutput output{stream_, size_t{1} << 30, account};
+  output.setObserver(observer_);
+  output.open();
+  const auto send = [&output](Kind kind, size_t bytes) {
+    return output.send(
+        [bytes](MessageWriter& out, uint32_t serial) {
+          out.beginSignal(serial, "/a", "b.c", "Passed", "s");
+          out.writeString(std::string(bytes, 'a'));
+          return out.end();
+        },
+        kind);
+  };
+  pipe_->room = 100;
+  EXPECT_EQ(send(Kind::bounded, 4 * Limits::socketBytes), Sent::queueFull);
+  EXPECT_EQ(account->holds(Share::bytes), 0U);
+  EXPECT_EQ(send(Kind::bounded, 2 * Limits::socketBytes), Sent::yes);
+  EXPECT_GT(account->holds(Share::bytes), 2 * Limits::socketBytes);
+  EXPECT_EQ(send(Kind::bounded, 2 * Limits::socketBytes), Sent::queueFull);
+  EXPECT_EQ(observer_->overflowed, 0);
+  pipe_->room = SIZE_MAX;
+  output.writable();
+  EXPECT_EQ(arrived(), 1U);
+  EXPECT_EQ(account->holds(Share::bytes), 0U);
+  // What the socket takes at once needs no share.
+  Charge others(account, Share::bytes);
+  others.setAnyway(5 * Limits::socketBytes);
+  EXPECT_EQ(send(Kind::bounded, 1000), Sent::yes);
+  EXPECT_EQ(arrived(), 2U);
+  EXPECT_EQ(observer_->overflowed, 0);
 }
 
 TEST_F(ConnectionOutputTest, SaysThatAMessageCannotBeWrittenAndLeavesNothingOfIt) {

@@ -49,8 +49,8 @@ std::string eventLine(const Dictionary& event) {
   if (status != 0) fate += ": " + std::to_string(status);
   const bool internal = event.boolean("internal");
   return line(clockText(time, time), std::to_string(numberIn(event, "user")),
-              internal ? "(start, stop)" : textIn(event, "client") + ":" + textIn(event, "service"),
-              textIn(event, "backEnd"), numberOr(event, "category") + "/" + numberOr(event, "type"), fate);
+              internal ? "(start, stop)" : programText(event), textIn(event, "backEnd"),
+              numberOr(event, "category") + "/" + numberOr(event, "type"), fate);
 }
 
 // In lines of whole characters.

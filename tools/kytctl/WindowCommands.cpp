@@ -6,6 +6,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/ReportingProgram.h"
 #include "platform/base/TextEscape.h"
 #include "tools/kytctl/Columns.h"
 #include "tools/kytctl/Commands.h"
@@ -32,8 +33,7 @@ std::string backEndText(const Dictionary& backEnd, int64_t now) {
 void addSession(Columns& columns, const Dictionary& session, int64_t now) {
   const std::string program = textIn(session, "program"), token = textIn(session, "token");
   columns.add({std::to_string(numberIn(session, "pid")), std::to_string(numberIn(session, "user")),
-               program.substr(program.rfind('/') + 1), textIn(session, "family"),
-               textIn(session, "client") + ":" + textIn(session, "service"),
+               program.substr(program.rfind('/') + 1), textIn(session, "family"), programText(session),
                spanText(now - numberIn(session, "since")), std::to_string(numberIn(session, "sessionID")),
                token.empty() ? "" : token + " level " + std::to_string(numberIn(session, "level"))});
   const Array* backEnds = session.array("backEnds");
@@ -42,6 +42,16 @@ void addSession(Columns& columns, const Dictionary& session, int64_t now) {
       columns.addNote(backEndText(*backEnd, now));
 }
 
+constexpr size_t kProgramCharacters = 26;
+// The user of the row that all users share.
+constexpr int64_t kAllUsers = 4294967295;
+// Where an event may wait: the key, and what the documents call it.
+constexpr std::pair<const char*, const char*> kPlaces[] = {{"queued", "queued"},
+                                                           {"batched", "batched"},
+                                                           {"inFlight", "in-flight"},
+                                                           {"waiting", "waiting"},
+                                                           {"outbox", "outbox"}};
+
 std::string droppedText(const Dictionary& row) {
   std::string text;
   const Dictionary* reasons = row.dictionary("droppedBy");
@@ -49,6 +59,38 @@ std::string droppedText(const Dictionary& row) {
   for (const auto& entry : *reasons)
     text += (text.empty() ? "" : ", ") + entry.key.str() + " " + std::to_string(entry.value.longLongValue());
   return text;
+}
+
+std::string pendingText(const Dictionary& row) {
+  std::string text;
+  for (const auto& [key, place] : kPlaces)
+    if (const int64_t events = numberIn(row, key); events != 0)
+      text += (text.empty() ? "" : ", ") + std::string(place) + " " + std::to_string(events);
+  return text;
+}
+
+// What is too long for its column stands in full beneath: names that begin alike are of different programs.
+void addBookRow(Columns& columns, const Dictionary& row) {
+  int64_t pending = 0;
+  for (const auto& [key, place] : kPlaces) pending += numberIn(row, key);
+  const int64_t merged = numberIn(row, "programsMerged"), user = numberIn(row, "user");
+  const bool internal = row.boolean("internal");
+  const std::string program = programText(row);
+  columns.add({user == kAllUsers ? "(all)" : std::to_string(user), textIn(row, "family"),
+               internal      ? "(start and stop)"
+               : merged != 0 ? "(other programs)"
+                             : program,
+               textIn(row, "backEnd"), std::to_string(numberIn(row, "taken")), std::to_string(pending),
+               std::to_string(numberIn(row, "delivered")), std::to_string(numberIn(row, "dropped"))});
+  constexpr size_t kNoteBytes = 90;
+  if (merged != 0) {
+    columns.addNote("of " + std::to_string(merged) + " programs, or more, without rows of their own");
+  } else if (cutText(program, kProgramCharacters) != program) {
+    for (std::string_view rest = program; !rest.empty(); rest.remove_prefix(cutUTF8(rest, kNoteBytes).size()))
+      columns.addNote(cutUTF8(rest, kNoteBytes));
+  }
+  if (pending != 0) columns.addNote("pending: " + pendingText(row));
+  if (const std::string why = droppedText(row); !why.empty()) columns.addNote(why);
 }
 
 }  // namespace
@@ -124,22 +166,13 @@ int booksCommand(const std::string& root, bool json) {
   }
   Columns columns({{"USER", 7, true},
                    {"TYPE", 4},
-                   {"CLIENT:SERVICE", 26},
+                   {"CLIENT:SERVICE", kProgramCharacters},
                    {"BACK END", 12},
                    {"TAKEN", 9, true},
                    {"PENDING", 8, true},
                    {"DELIVERED", 9, true},
                    {"DROPPED", 9, true}});
-  for (const Dictionary& row : rows) {
-    const int64_t pending = numberIn(row, "queued") + numberIn(row, "batched") + numberIn(row, "inFlight") +
-                            numberIn(row, "waiting") + numberIn(row, "outbox");
-    const bool internal = row.boolean("internal");
-    columns.add({std::to_string(numberIn(row, "user")), textIn(row, "family"),
-                 internal ? "(start and stop)" : textIn(row, "client") + ":" + textIn(row, "service"),
-                 textIn(row, "backEnd"), std::to_string(numberIn(row, "taken")), std::to_string(pending),
-                 std::to_string(numberIn(row, "delivered")), std::to_string(numberIn(row, "dropped"))});
-    if (const std::string why = droppedText(row); !why.empty()) columns.addNote(why);
-  }
+  for (const Dictionary& row : rows) addBookRow(columns, row);
   std::fputs(columns.text().c_str(), stdout);
   return 0;
 }

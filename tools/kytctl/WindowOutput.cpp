@@ -5,7 +5,9 @@
 #include <charconv>
 #include <cstdio>
 
+#include "platform/base/TextEscape.h"
 #include "platform/linux/data/RapidJSON.h"
+#include "tools/kytctl/StatusText.h"
 
 namespace kyt::tools {
 
@@ -19,6 +21,17 @@ Value listed(const char* key, std::vector<Dictionary> rows) {
   Array array;
   for (Dictionary& row : rows) array.append(std::move(row));
   return Dictionary{{key, std::move(array)}};
+}
+
+std::string programText(const Dictionary& program) {
+  std::string text;
+  for (const char c : escapedName(textIn(program, "client"))) {
+    if (c == ':')
+      text += "\\x3a";
+    else
+      text += c;
+  }
+  return text + ":" + escapedName(textIn(program, "service"));
 }
 
 std::optional<uint32_t> userOf(const std::string& text) {

@@ -14,6 +14,8 @@ namespace kyt::tools {
 // One line.
 void printJSON(const Value& value);
 [[nodiscard]] Value listed(const char* key, std::vector<Dictionary> rows);
+// A program's names, "client" and "service", as "client:service": no two pairs of names alike, and escaped already.
+[[nodiscard]] std::string programText(const Dictionary& program);
 // By name or number; none: there is no such user.
 [[nodiscard]] std::optional<uint32_t> userOf(const std::string& text);
 

@@ -237,13 +237,13 @@ TEST(Fates, AreReasonsThatStandOnce) {
 // Rows are bounded: clients choose the names of programs.
 class BookRows : public testing::Test {
  protected:
-  void book(uint32_t user, const std::string& name) {
-    books_.open({user, 7, name, "s"}, "httppost", false)->take();
+  void book(uint32_t user, const std::string& name, bool isInternal = false) {
+    books_.open({user, 7, name, "s"}, "httppost", isInternal)->take();
   }
-  const BookRow* other(uint32_t user) {
+  const BookRow* other(uint32_t user, bool isInternal = false) {
     rows_ = books_.snapshot();
     for (const BookRow& row : rows_)
-      if (row.programsMerged != 0 && row.program.user == user) return &row;
+      if (row.programsMerged != 0 && row.program.user == user && row.isInternal == isInternal) return &row;
     return nullptr;
   }
   uint64_t takenInAll() const {
@@ -269,6 +269,40 @@ TEST_F(BookRows, OfProgramsPastTheLimitAreTheirUsersOther) {
   EXPECT_EQ(other(1000)->taken, 60U) << "a program that has a row keeps it";
 }
 
+TEST_F(BookRows, OfProgramsPastTheLimitTellTheDaemonsOwnMessagesFromTheirEvents) {
+  for (size_t i = 0; i < Limits::maxBookRowsOfUser; ++i) book(1000, "program " + std::to_string(i));
+  for (const char* name : {"a", "b", "c"}) book(1000, name);
+  for (const char* name : {"a", "b", "b"}) book(1000, name, true);
+  ASSERT_NE(other(1000), nullptr);
+  EXPECT_EQ(other(1000)->taken, 3U);
+  EXPECT_EQ(other(1000)->programsMerged, 3U);
+  ASSERT_NE(other(1000, true), nullptr);
+  EXPECT_EQ(other(1000, true)->taken, 3U);
+  EXPECT_EQ(other(1000, true)->programsMerged, 2U);
+  const auto tally = books_.open({1000, 7, "d", "s"}, "httppost", true);
+  EXPECT_TRUE(tally->rowName().isInternal && tally->rowName().isOther);
+  EXPECT_TRUE(tally->passed({}, std::nullopt).isInternal);
+}
+
+TEST_F(BookRows, ThatWereKeptAreFoundAgainAndCountNoProgram) {
+  for (size_t i = 0; i <= Limits::maxBookRowsOfUser; ++i) book(1000, "program " + std::to_string(i));
+  for (const bool isInternal : {false, true}) {
+    const BookRowName name = books_.open({1000, 7, "a", "s"}, "httppost", isInternal)->rowName();
+    const uint64_t programs = other(1000, isInternal)->programsMerged, taken = other(1000, isInternal)->taken;
+    books_.reopen(name)->take();
+    EXPECT_EQ(other(1000, isInternal)->taken, taken + 1);
+    EXPECT_EQ(other(1000, isInternal)->programsMerged, programs);
+  }
+}
+
+// Hashes of merged programs are bounded for all users together, and no user's keep those of another from being counted.
+TEST_F(BookRows, CountTheMergedProgramsOfAUserWhateverAnotherDoes) {
+  for (size_t i = 0; i < 10000; ++i) book(1000, std::to_string(i));
+  EXPECT_GT(other(1000)->programsMerged, 4096U);
+  for (size_t i = 0; i < Limits::maxBookRowsOfUser + 20; ++i) book(1001, std::to_string(i));
+  EXPECT_EQ(other(1001)->programsMerged, 20U);
+}
+
 TEST_F(BookRows, OfAUserWithManyProgramsLeaveRoomForAnother) {
   for (size_t i = 0; i < 2 * Limits::maxBookRows; ++i) book(1000, std::to_string(i));
   book(1001, "a");
@@ -277,7 +311,10 @@ TEST_F(BookRows, OfAUserWithManyProgramsLeaveRoomForAnother) {
 
 TEST_F(BookRows, AreNeverMoreThanTheLimitWhoeverComes) {
   uint64_t events = 0;
-  for (uint32_t user = 1; user <= 3 * Limits::maxBookRows; ++user, ++events) book(user, "a");
+  for (uint32_t user = 1; user <= 3 * Limits::maxBookRows; ++user, events += 2) {
+    book(user, "a");
+    book(user, "a", true);
+  }
   for (size_t i = 0; i < 3 * Limits::maxBookRows; ++i, ++events) book(9, std::to_string(i));
   EXPECT_EQ(books_.snapshot().size(), Limits::maxBookRows);
   EXPECT_EQ(takenInAll(), events);

@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
+#include <set>
+
 namespace kyt {
 namespace {
 
@@ -56,6 +59,25 @@ TEST(BeginningOf, TellsLongTextsApartAndLeavesShortOnes) {
   EXPECT_EQ(beginningOf("0123456789abcdef0123456789abcdef"), "01234567...");
   EXPECT_EQ(beginningOf("1234567\u00e9\u00e9\u00e9\u00e9"), "1234567...") << "no half of a character";
   EXPECT_EQ(beginningOf(std::string(20, '\x80')), "...");
+}
+
+TEST(TextEscape, WritesNoTwoNamesAlike) {
+  EXPECT_EQ(escapedName("plain"), "plain");
+  EXPECT_EQ(escapedName("a\n"), "a\\n");
+  EXPECT_EQ(escapedName("a\\n"), "a\\x5cn");
+  EXPECT_EQ(escapedName("\\"), "\\x5c");
+  EXPECT_EQ(escapedName("\\\\x5c"), "\\x5c\\x5cx5c");
+  std::set<std::string> written;
+  const char kLetters[] = {'\\', '\n', 'n', 'x', '0', '1', '\x01', '\xC2', '\x85'};
+  size_t names = 0;
+  const std::function<void(std::string)> all = [&](const std::string& name) {
+    written.insert(escapedName(name));
+    ++names;
+    if (name.size() < 4)
+      for (const char letter : kLetters) all(name + letter);
+  };
+  all("");
+  EXPECT_EQ(written.size(), names);
 }
 
 TEST(TextEscape, LeavesLineBreaksOfLines) {
