@@ -12,6 +12,8 @@
 namespace kyt {
 namespace {
 
+// The pool gives one thread to each owner, so this queue runs beside one that waits for the disk. No user has this number.
+constexpr uint64_t kDeadlinesOwner = ~uint64_t{0};
 constexpr int64_t kClockWasSet = 1577836800;  // a clock before 2020 has not been set
 
 }  // namespace
@@ -24,6 +26,7 @@ Outbox::Outbox(Ports ports, OutboxSettings settings)
     : ports_(ports),
       settings_(settings),
       queue_(SerialQueue::create("kyt.outbox", ports.executor)),
+      deadlines_(SerialQueue::create("kyt.outbox deadlines", ports.executor, kDeadlinesOwner)),
       books_(ports.books, ports.counters) {}
 
 void Outbox::begin() {
@@ -43,38 +46,97 @@ void Outbox::wake() {
 
 bool Outbox::isTaking() const {
   MutexLock lock(mutex_);
-  return ports_.clock.monotonic() >= diskRestsUntil_;
+  return ports_.clock.monotonic() >= diskRestsUntil_ && !isDiskSlow_;
+}
+
+bool Outbox::diskRests() const {
+  MutexLock lock(mutex_);
+  return ports_.clock.monotonic() < diskRestsUntil_;
 }
 
 bool Outbox::isConsentGiven() const {
   return ports_.consent.isSubmissionAllowed();
 }
 
-void Outbox::refuse(Incoming& post) {
+void Outbox::refuse(const std::string& server, Function<void(bool)> settled) {
   if (ports_.counters.addAndMayLog(Reason::postNotKept, ports_.clock.monotonic()))
-    ports_.log.error("Outbox(keep): A post to %s that failed cannot be kept",
-                     serverOfLine(post.failed.post.url).c_str());
-  post.settled(false);
+    ports_.log.error("Outbox(keep): A post to %s that failed cannot be kept", server.c_str());
+  settled(false);
+}
+
+void Outbox::refuse(const Incoming& post) {
+  if (auto waiting = takeWaiting(post.ticket)) refuse(waiting->server, std::move(waiting->settled));
+}
+
+std::optional<Outbox::Waiting> Outbox::takeWaiting(uint64_t ticket) {
+  MutexLock lock(mutex_);
+  auto known = waiting_.extract(ticket);
+  if (known.empty()) return std::nullopt;
+  return std::move(known.mapped());
+}
+
+bool Outbox::isWaiting(uint64_t ticket) const {
+  MutexLock lock(mutex_);
+  return waiting_.contains(ticket);
+}
+
+// One post finds room however large it is; what one user has on the way takes nobody else's.
+bool Outbox::hasRoomOnTheWay(uint32_t user, size_t bytes) {
+  const auto known = bytesOfUsersOnTheWay_.find(user);
+  const size_t ofUser = known != bytesOfUsersOnTheWay_.end() ? known->second : 0;
+  return (bytesOnTheWay_ == 0 || bytesOnTheWay_ + bytes <= Limits::maxBytesOnTheWayToTheOutbox) &&
+         (ofUser == 0 || ofUser + bytes <= Limits::maxBytesOfAUserOnTheWayToTheOutbox);
 }
 
 void Outbox::keep(FailedPost post, Function<void(bool)> settled) {
   const uint64_t bytes = PostStore::bytesOf(post.post);
-  Incoming incoming{std::move(post), std::move(settled)};
-  bool hasRoom = false;
+  const uint32_t user = post.post.user;
+  std::string server = serverOfLine(post.post.url);
   {
     MutexLock lock(mutex_);
-    hasRoom = ports_.clock.monotonic() >= diskRestsUntil_ &&
-              (bytesOnTheWay_ == 0 || bytesOnTheWay_ + bytes <= Limits::maxBytesOnTheWayToTheOutbox);
-    if (hasRoom) {
+    const MonotonicTime now = ports_.clock.monotonic();
+    if (now >= diskRestsUntil_ && !isDiskSlow_ && hasRoomOnTheWay(user, bytes)) {
       bytesOnTheWay_ += bytes;
+      bytesOfUsersOnTheWay_[user] += bytes;
       inbox_.bytes += bytes;
-      inbox_.posts.push_back(std::move(incoming));
+      inbox_.bytesOfUsers[user] += bytes;
+      inbox_.posts.push_back({std::move(post), ++lastTicket_});
+      waiting_[lastTicket_] = {std::move(settled), now, std::move(server)};
+      watchDeadline();
+      settled = nullptr;
     }
   }
-  if (hasRoom)
-    wake();
+  if (settled)
+    refuse(server, std::move(settled));
   else
-    refuse(incoming);
+    wake();
+}
+
+void Outbox::watchDeadline() {
+  if (isDeadlineWatched_ || waiting_.empty()) return;
+  isDeadlineWatched_ = true;
+  const Duration left = waiting_.begin()->second.since + Limits::outboxCommitTime - ports_.clock.monotonic();
+  deadline_ = ports_.timers.after(left, deadlines_, [weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->tellWhoWaitedTooLong();
+  });
+}
+
+// The disk may be stuck in the midst of a change: who waits for it goes on without, and nobody else begins to wait.
+void Outbox::tellWhoWaitedTooLong() {
+  std::vector<Waiting> late;
+  {
+    MutexLock lock(mutex_);
+    isDeadlineWatched_ = false;
+    const MonotonicTime since = ports_.clock.monotonic() - Limits::outboxCommitTime;
+    while (!waiting_.empty() && waiting_.begin()->second.since <= since)
+      late.push_back(std::move(waiting_.extract(waiting_.begin()).mapped()));
+    isDiskSlow_ = isDiskSlow_ || !late.empty();
+    watchDeadline();
+  }
+  if (late.empty()) return;
+  ports_.log.error("Outbox: Its disk has taken longer than %lld s, %zu posts go the usual way",
+                   static_cast<long long>(Limits::outboxCommitTime.count()), late.size());
+  for (Waiting& waiting : late) refuse(waiting.server, std::move(waiting.settled));
 }
 
 void Outbox::serverAnswers(std::string_view url) {
@@ -126,10 +188,7 @@ void Outbox::turn() {
     if (removesForGood_) commit(Plan());
   }
   keepAll(std::move(inbox.posts));
-  {
-    MutexLock lock(mutex_);
-    bytesOnTheWay_ -= inbox.bytes;
-  }
+  turnIsOver(inbox);
   takeNews(inbox);
   if (posts_.size() == 0 && isLoaded_) {
     books_.dropRest(Reason::outboxUnreadable);  // of posts that were not what had been kept
@@ -143,6 +202,18 @@ void Outbox::turn() {
   sendWhatIsDue();
   watchConnectivity();
   setTimer();
+}
+
+// All that came before it is on disk, or told.
+void Outbox::turnIsOver(const Inbox& inbox) {
+  MutexLock lock(mutex_);
+  bytesOnTheWay_ -= inbox.bytes;
+  for (const auto& [user, bytes] : inbox.bytesOfUsers) {
+    const auto known = bytesOfUsersOnTheWay_.find(user);
+    known->second -= bytes;
+    if (known->second == 0) bytesOfUsersOnTheWay_.erase(known);
+  }
+  if (std::exchange(isDiskSlow_, false)) diskRestsUntil_ = ports_.clock.monotonic() + kDiskPause;
 }
 
 void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
@@ -213,18 +284,19 @@ void Outbox::keepAll(std::vector<Incoming> posts) {
   Plan plan;
   const int64_t now = ports_.clock.timeOfDay().seconds;
   for (Incoming& incoming : posts) {
+    if (!isWaiting(incoming.ticket)) continue;
     StoredPost& post = incoming.failed.post;
     const uint64_t bytes = PostStore::bytesOf(post);
     const bool fits =
         bytes <= settings_.maxBytes && bytes <= settings_.maxBytesPerUser && bytes <= UINT32_MAX;
-    if (!isLoaded_ || !fits || !isTaking() || (post.isByConsent && !wasConsentGiven_)) {
+    if (!isLoaded_ || !fits || diskRests() || (post.isByConsent && !wasConsentGiven_)) {
       refuse(incoming);
       continue;
     }
     if (!makeRoom(plan, post.user, bytes)) {
       commit(std::move(plan));  // what is new is displaced only when it is there
       plan = Plan();
-      if (!isTaking() || !makeRoom(plan, post.user, bytes)) {
+      if (diskRests() || !makeRoom(plan, post.user, bytes)) {
         refuse(incoming);
         continue;
       }
@@ -248,6 +320,13 @@ void Outbox::kept(Plan& plan) {
   for (Incoming& incoming : plan.posts) {
     last_ = incoming.failed.post.number;
     const StoredPost& post = incoming.failed.post;
+    auto waiting = takeWaiting(incoming.ticket);
+    if (!waiting) {  // told already that it is not kept
+      removed_.push_back(last_);
+      posts_.remove(*posts_.find(last_));
+      wake();
+      continue;
+    }
     books_.enter(last_, incoming.failed.booked, post.events, incoming.failed.status);
     if (incoming.failed.mayHaveLeft)
       tellOwner(post.url, post.events, post.body.view().size(), !incoming.failed.isUnanswered);
@@ -259,7 +338,7 @@ void Outbox::kept(Plan& plan) {
       fail(line, incoming.failed.retryAfter, incoming.failed.isUnanswered);
     else if (incoming.failed.retryAfter)
       pause(line, *incoming.failed.retryAfter);
-    incoming.settled(true);
+    waiting->settled(true);
   }
 }
 

@@ -91,7 +91,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   // Reads what an earlier process left, and sends it.
   void begin();
   // Keeps the post, or not: `settled` is told once, when it is on disk (the post counts as outbox in the books then) or
-  // when it cannot be: on the caller's thread before this returns, or on the outbox's queue.
+  // when it cannot be: on the caller's thread before this returns, on the outbox's queue, or on another one when the disk has
+  // taken longer than Limits::outboxCommitTime.
   void keep(FailedPost post, Function<void(bool isKept)> settled);
   // Whether there is hope that a post can be kept.
   [[nodiscard]] bool isTaking() const EXCLUDES(mutex_);
@@ -117,7 +118,13 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
  private:
   struct Incoming {
     FailedPost failed;
+    uint64_t ticket = 0;  // of who waits
+  };
+  // Who waits to be told whether a post is kept; told by the queue, or when the disk takes too long.
+  struct Waiting {
     Function<void(bool)> settled;
+    MonotonicTime since{};
+    std::string server;
   };
   // A post on its way.
   struct Sending {
@@ -143,6 +150,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
     std::vector<Answer> answers;
     std::vector<std::string> answering;  // servers
     size_t bytes = 0;
+    std::map<uint32_t, size_t> bytesOfUsers;
     bool connectivityChanged = false, flush = false;
   };
   // A change of the file, and of what is known of it, that happens as a whole or not.
@@ -154,6 +162,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   Outbox(Ports ports, OutboxSettings settings);
   void wake() EXCLUDES(mutex_);
   void turn() REQUIRES(*queue_) EXCLUDES(mutex_);
+  void turnIsOver(const Inbox& inbox) REQUIRES(*queue_) EXCLUDES(mutex_);
   void load() REQUIRES(*queue_);
   [[nodiscard]] int64_t bornAt(int64_t keptAt) const;
   [[nodiscard]] int64_t seconds() const;
@@ -182,7 +191,15 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void commit(Plan plan) REQUIRES(*queue_);
   void kept(Plan& plan) REQUIRES(*queue_);
   void notKept(Plan& plan) REQUIRES(*queue_);
-  void refuse(Incoming& post);
+  void refuse(const std::string& server, Function<void(bool)> settled);
+  void refuse(const Incoming& post) EXCLUDES(mutex_);
+  // None: it was told already.
+  [[nodiscard]] std::optional<Waiting> takeWaiting(uint64_t ticket) EXCLUDES(mutex_);
+  [[nodiscard]] bool isWaiting(uint64_t ticket) const EXCLUDES(mutex_);
+  [[nodiscard]] bool hasRoomOnTheWay(uint32_t user, size_t bytes) REQUIRES(mutex_);
+  void watchDeadline() REQUIRES(mutex_);
+  void tellWhoWaitedTooLong() EXCLUDES(mutex_);
+  [[nodiscard]] bool diskRests() const EXCLUDES(mutex_);
   void handle(const PostStoreProblem& problem) REQUIRES(*queue_);
   [[nodiscard]] bool cannotRead(KeptPosts::Entry& entry, const PostStoreProblem& problem) REQUIRES(*queue_);
   void lose(KeptPosts::Entry& entry, const PostStoreProblem& problem) REQUIRES(*queue_);
@@ -198,7 +215,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   // Constant.
   const Ports ports_;
   const OutboxSettings settings_;
-  const std::shared_ptr<SerialQueue> queue_;
+  const std::shared_ptr<SerialQueue> queue_, deadlines_;
 
   // Self-synchronised.
   std::atomic<size_t> size_{0};
@@ -206,6 +223,13 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   mutable Mutex mutex_;
   Inbox inbox_ GUARDED_BY(mutex_);
   size_t bytesOnTheWay_ GUARDED_BY(mutex_) = 0;
+  std::map<uint32_t, size_t> bytesOfUsersOnTheWay_ GUARDED_BY(mutex_);
+  std::map<uint64_t, Waiting> waiting_ GUARDED_BY(mutex_);  // by ticket: in the order in which they came
+  uint64_t lastTicket_ GUARDED_BY(mutex_) = 0;
+  bool isDeadlineWatched_ GUARDED_BY(mutex_) = false;
+  bool isDiskSlow_ GUARDED_BY(mutex_) =
+      false;  // the turn that goes on has kept somebody waiting for too long
+  TimerHandle deadline_ GUARDED_BY(mutex_);
   bool isAwake_ GUARDED_BY(mutex_) = false;
   MonotonicTime diskRestsUntil_ GUARDED_BY(mutex_){};
 

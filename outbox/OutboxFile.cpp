@@ -18,7 +18,7 @@ constexpr unsigned kMostDoublings = 6;
 }  // namespace
 
 void Outbox::load() {
-  if (!isTaking()) return;
+  if (diskRests()) return;
   std::map<BookRowName, uint64_t> found;
   const auto problem = ports_.store.open([this, &found](StoredPostHead head) {
     queue_->assertCurrent();
@@ -59,7 +59,7 @@ OutboxBooks::Events Outbox::eventsOf(const KeptPosts::Entry& entry) {
 
 void Outbox::commit(Plan plan) {
   if (plan.posts.empty() && plan.displaced.empty() && removed_.empty()) return;
-  if (!isTaking()) return notKept(plan);
+  if (diskRests()) return notKept(plan);
   std::vector<const StoredPost*> added;
   added.reserve(plan.posts.size());
   for (const Incoming& post : plan.posts) added.push_back(&post.failed.post);

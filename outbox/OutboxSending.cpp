@@ -157,7 +157,7 @@ void Outbox::takeNews(const Inbox& inbox) {
 // What left by an answer is off the disk before more is sent: so a process that is killed sends nothing twice but what was
 // on its way.
 void Outbox::sendWhatIsDue() {
-  if (isStopping_ || !isLoaded_ || !removed_.empty() || !isTaking()) return;
+  if (isStopping_ || !isLoaded_ || !removed_.empty() || diskRests()) return;
   if (ports_.clock.monotonic() < readingRestsUntil_) return;
   for (auto& [server, line] : posts_.lines()) sendFrom(line);
 }
@@ -252,7 +252,7 @@ void Outbox::setTimer() {
   if (posts_.size() == 0 && removed_.empty() && isLoaded_) return;
   const MonotonicTime now = ports_.clock.monotonic();
   MonotonicTime next = now + kLongestRest;
-  if (!isTaking() || !isLoaded_ || !removed_.empty()) {
+  if (diskRests() || !isLoaded_ || !removed_.empty()) {
     next = now + kDiskPause;
   } else if (!isStopping_) {
     for (const auto& [server, line] : posts_.lines())

@@ -35,6 +35,9 @@ bool isNoAddress(const std::optional<Error>& error) {
          (error->code == kUnsupportedProtocol || error->code == kMalformedAddress);
 }
 
+// The owner of the queue for posts of no user's: not the outbox's own, which may wait for its disk.
+constexpr uint64_t kNobody = ~uint64_t{0};
+
 // Counts while its completion has neither run nor been destroyed.
 class Outstanding {
  public:
@@ -124,7 +127,7 @@ class OutboxSessionState : public std::enable_shared_from_this<OutboxSessionStat
       startPost(std::make_shared<Post>(std::move(post)));
       return;
     }
-    const uint64_t owner = post.request.account ? uint64_t{post.request.account->user()} + 1 : 0;
+    const uint64_t owner = post.request.account ? uint64_t{post.request.account->user()} + 1 : kNobody;
     queue(owner)->asyncBeside([post = std::move(post), reply = std::move(reply)]() mutable {
       post.completion(std::move(reply.data), std::move(reply.response), std::move(reply.error));
     });

@@ -104,6 +104,9 @@ struct Limits {
   // bytes that are sent again at a time (one post to each server goes in any case).
   static constexpr size_t maxOutboxPosts = 131072;
   static constexpr size_t maxBytesOnTheWayToTheOutbox = 8u << 20;
+  static constexpr size_t maxBytesOfAUserOnTheWayToTheOutbox = 2u << 20;
+  // A post that is not on its disk by then goes the usual way, so that no session waits longer for a disk that is stuck.
+  static constexpr std::chrono::seconds outboxCommitTime{5};
   static constexpr size_t maxOutboxBytesInFlight = 4u << 20;
   // Requests of it at a time, to all servers: servers that are silent leave room for what is posted meanwhile.
   static constexpr size_t maxOutboxRequestsInFlight = 64;

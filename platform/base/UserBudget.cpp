@@ -38,6 +38,7 @@ UserShares UserShares::of(const Limits& limits, uint64_t memory, uint64_t descri
   shares[Share::identifiers] = limits.maxCustomIdentifiersPerUser;
   shares[Share::logLines] = Limits::maxLogLinesPerSecond;
   shares[Share::workers] = Limits::maxWorkersPerUser;
+  shares[Share::outboxBytes] = Limits::maxBytesOfAUserOnTheWayToTheOutbox;
   return shares;
 }
 

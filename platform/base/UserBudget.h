@@ -42,6 +42,7 @@ enum class Share : uint8_t {
   identifiers,      // TomlUserDefaults: custom ones of its programs, kept on disk for good
   logLines,         // LineLimits: of each text a second
   workers,          // WorkerPool: that run its connections, or wait in them
+  outboxBytes,      // Outbox: on their way to its disk
   numberOfShares
 };
 
@@ -65,6 +66,7 @@ inline constexpr std::array<ShareRow, static_cast<size_t>(Share::numberOfShares)
     {Share::identifiers, "identifiers", "identifiers", "max_custom_identifiers_per_user"},
     {Share::logLines, "log lines", "lines a second", ""},
     {Share::workers, "workers", "threads", ""},
+    {Share::outboxBytes, "outbox", "bytes", ""},
 }};
 
 // What can be dropped piece by piece (events, posts, shared data) leaves such a part of the bytes to what else would

@@ -12,7 +12,7 @@
 
 namespace kyt {
 
-class FakePostStore final : public PostStore {
+class FakePostStore : public PostStore {
  public:
   struct Disk {
     std::map<int64_t, StoredPost> posts;

@@ -671,16 +671,30 @@ TEST_F(OutboxTest, SendsNothingMoreWhileTheDiskCannotForgetWhatWasTaken) {
 }
 
 TEST_F(OutboxTest, TakesNoMoreThanFitsInMemoryWhileTheDiskIsSlow) {
-  settings_.maxBytesPerUser = settings_.maxBytes;
   start();
   std::vector<std::shared_ptr<Outcome>> outcomes;
-  for (int i = 0; i < 10; ++i) outcomes.push_back(post(std::string(1 << 20, 'x')));
+  for (uint32_t i = 0; i < 10; ++i) outcomes.push_back(post(std::string(1 << 20, 'x'), 1000 + i));
   for (size_t i = 0; i < outcomes.size(); ++i) network_->complete(i, 503);
   drain();
   size_t kept = 0;
   for (const auto& outcome : outcomes) kept += outcome->response ? 0 : 1;
   EXPECT_EQ(kept, (Limits::maxBytesOnTheWayToTheOutbox >> 20) - 1);
   EXPECT_EQ(test_.counters.value(Reason::postNotKept), outcomes.size() - kept);
+}
+
+TEST_F(OutboxTest, LeavesOthersRoomOnTheWayWhateverOneUserHasThere) {
+  start();
+  std::vector<std::shared_ptr<Outcome>> outcomes;
+  for (int i = 0; i < 10; ++i) outcomes.push_back(post(std::string(1 << 20, 'x'), 1000));
+  const auto ofAnother = post(std::string(1 << 20, 'x'), 2000);
+  const auto large = post(std::string(3 << 20, 'x'), 3000);
+  for (size_t i = 0; i < outcomes.size() + 2; ++i) network_->complete(i, 503);
+  drain();
+  size_t kept = 0;
+  for (const auto& outcome : outcomes) kept += outcome->response ? 0 : 1;
+  EXPECT_EQ(kept, (Limits::maxBytesOfAUserOnTheWayToTheOutbox >> 20) - 1);
+  EXPECT_FALSE(ofAnother->response);
+  EXPECT_FALSE(large->response) << "one has room in any case";
 }
 
 TEST_F(OutboxTest, PutsWhatFailsTogetherOnTheDiskTogether) {
