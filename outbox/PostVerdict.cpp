@@ -50,7 +50,8 @@ PostVerdict verdictOf(const URLResponse* response, const Error* error) {
   if (status >= 300 && status <= 399) return PostVerdict::redirected;
   if (status >= 400 && status <= 499) return PostVerdict::refused;
   if (status >= 500 && status <= 599) return PostVerdict::braked;
-  return error != nullptr ? PostVerdict::sendAgain : PostVerdict::taken;
+  const bool hasDecided = status >= 200;
+  return error != nullptr && !hasDecided ? PostVerdict::sendAgain : PostVerdict::taken;
 }
 
 std::optional<Duration> retryAfter(const URLResponse* response, TimeValue now) {

@@ -33,6 +33,10 @@ class OutboxOfTheDaemon : public ::testing::Test {
       }
       reply.status = percentTaken_ > static_cast<int>(random_() % 100) ? 200 : 503;
       if (!retryAfter_.empty()) reply.headers.emplace_back("Retry-After", retryAfter_);
+      if (breaksOff_) {
+        reply.body = "half of it is sent";
+        reply.behaviour = TestHTTPServer::Behaviour::stopMidBody;
+      }
       if (holds_) reply.behaviour = TestHTTPServer::Behaviour::hold;
       const bool isTaken = reply.status == 200 && !holds_;
       ++(isTaken ? taken_ : failed_)[request.body];
@@ -97,6 +101,10 @@ class OutboxOfTheDaemon : public ::testing::Test {
     const std::lock_guard lock(mutex_);
     holds_ = holds;
   }
+  void breakOff(bool breaks) {
+    const std::lock_guard lock(mutex_);
+    breaksOff_ = breaks;
+  }
   [[nodiscard]] std::map<std::string, int> taken() const {
     const std::lock_guard lock(mutex_);
     return taken_;
@@ -128,7 +136,7 @@ class OutboxOfTheDaemon : public ::testing::Test {
   std::mt19937 random_{1};
   int percentTaken_ = 0;
   std::string retryAfter_;
-  bool holds_ = false, started_ = false;
+  bool holds_ = false, breaksOff_ = false, started_ = false;
   std::string document_;
   std::map<std::string, int> taken_, failed_;        // bodies
   int life_ = 0;                                     // which daemon this is

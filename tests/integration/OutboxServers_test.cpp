@@ -65,8 +65,33 @@ INSTANTIATE_TEST_SUITE_P(
         Lie{"ResetsAfterTheBody", {.behaviour = Behaviour::reset}},
         Lie{"BreaksItsAnswerOff", {.status = 503, .body = "half of it", .behaviour = Behaviour::stopMidBody}},
         Lie{"DripsItsAnswer", {.status = 503, .body = std::string(4000, 'x'), .behaviour = Behaviour::drip}},
+        Lie{"TakesAndDripsItsAnswer", {.body = std::string(4000, 'x'), .behaviour = Behaviour::drip}},
         Lie{"NeverAnswers", {.behaviour = Behaviour::hold}}),
     [](const auto& test) { return test.param.name; });
+
+// The status says what became of a post, whatever becomes of the rest of the answer.
+TEST_F(OutboxOfTheDaemon, SendsNothingAgainWhoseAnswerBreaksOffAfterAGoodStatus) {
+  settings(kOn);
+  start();
+  TestClient client(daemon_.socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_.log();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{{"number", 1}}));
+  ASSERT_EQ(client.flush(), "flushed") << daemon_.log();
+  const auto kept = failed();
+  ASSERT_FALSE(kept.empty());
+  breakOff(true);
+  take(100);
+  ASSERT_TRUE(eventually([&] { return taken().size() >= kept.size(); })) << daemon_.log();
+  end();
+  start();
+  TestClient another(daemon_.socketPath(), kTorvel, "plain");
+  ASSERT_EQ(another.configure(), "live: httppost") << daemon_.log();
+  EXPECT_TRUE(another.send(9, 1, Dictionary{{"number", 2}}));
+  static_cast<void>(another.flush());
+  EXPECT_FALSE(daemon_.logged("are left from before")) << daemon_.log();
+  end();
+  for (const auto& [body, times] : taken()) EXPECT_EQ(times, 1);
+}
 
 // Nobody can tell that from a server that keeps what it takes: it is not sent again.
 TEST_F(OutboxOfTheDaemon, SendsNothingAgainThatAServerTookAndForgot) {

@@ -36,7 +36,10 @@ TEST(PostVerdict, TellsRefusalsFromTheOperatorsBrake) {
 TEST(PostVerdict, GoesByTheStatusOfAReplyThatBrokeOff) {
   EXPECT_EQ(verdictOfStatus(404, true), PostVerdict::refused);
   EXPECT_EQ(verdictOfStatus(503, true), PostVerdict::sendAgain);
-  EXPECT_EQ(verdictOfStatus(200, true), PostVerdict::sendAgain);
+  EXPECT_EQ(verdictOfStatus(501, true), PostVerdict::braked);
+  EXPECT_EQ(verdictOfStatus(200, true), PostVerdict::taken);
+  EXPECT_EQ(verdictOfStatus(600, true), PostVerdict::taken);
+  EXPECT_EQ(verdictOfStatus(0, true), PostVerdict::sendAgain);
 }
 
 TEST(PostVerdict, ReadsRetryAfterAsSecondsOrDate) {
