@@ -15,14 +15,10 @@
 
 namespace kyt {
 
-namespace {
-
 bool holdsCategory(const Array& list, uint16_t category) {
   return std::any_of(list.begin(), list.end(),
                      [category](const Value& entry) { return entry.intValue() == category; });
 }
-
-}  // namespace
 
 std::shared_ptr<KYTReportingBackend> KYTReportingBackend::initWithName(Platform& platform, String name,
                                                                        Dictionary profile,

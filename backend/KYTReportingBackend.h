@@ -69,6 +69,9 @@ class AnswerReader {
   [[nodiscard]] virtual bool wantsAnswer(size_t leastBytes) = 0;
 };
 
+// Whether a white or black list of the storebag names the category.
+[[nodiscard]] bool holdsCategory(const Array& list, uint16_t category);
+
 class KYTReportingBackend : public std::enable_shared_from_this<KYTReportingBackend> {
  protected:
   // What a constructor asks for, so that only classes of back ends can make one, through an initWithName(...) that

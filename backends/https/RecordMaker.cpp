@@ -1,6 +1,8 @@
 #include "backends/https/RecordMaker.h"
 
+#include <algorithm>
 #include <cmath>
+#include <iterator>
 #include <string_view>
 #include <utility>
 
@@ -37,6 +39,15 @@ const RecordKeys& recordKeys() {
   return keys;
 }
 
+constexpr const String RecordKeys::*kRecordKeys[] = {
+    &RecordKeys::startTS,       &RecordKeys::sender,       &RecordKeys::clientVersion,
+    &RecordKeys::sessionID,     &RecordKeys::eventNumber,  &RecordKeys::method,
+    &RecordKeys::status,        &RecordKeys::clientTS,     &RecordKeys::eventTime,
+    &RecordKeys::productFamily, &RecordKeys::productModel, &RecordKeys::osVersion,
+    &RecordKeys::build,         &RecordKeys::internal,     &RecordKeys::reportVers,
+    &RecordKeys::timezoneOffset};
+static_assert(std::size(kRecordKeys) == kFixedKeys);
+
 // All fixed keys begin with an underscore, except "eventTime".
 bool mayHoldFixedKey(const Dictionary& payload) {
   for (const DictionaryEntry& entry : payload) {
@@ -68,6 +79,12 @@ class RecordWriter {
 };
 
 }  // namespace
+
+bool isRecordKey(std::string_view key) {
+  return std::any_of(std::begin(kRecordKeys), std::end(kRecordKeys), [key](const String RecordKeys::*member) {
+    return (recordKeys().*member).view() == key;
+  });
+}
 
 RecordMaker::RecordMaker(const Configuration& configuration, SharedSessionFacts facts)
     : configuration_(configuration),

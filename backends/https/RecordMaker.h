@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <string_view>
 
 #include "backend/SessionFacts.h"
 #include "config/Configuration.h"
@@ -12,6 +13,9 @@
 #include "platform/objects/Value.h"
 
 namespace kyt {
+
+// Whether the record of an event has this key of its own: what a payload says under it is replaced.
+[[nodiscard]] bool isRecordKey(std::string_view key);
 
 class RecordMaker {
  public:

@@ -42,6 +42,13 @@ TEST_F(RecordMakerTest, TheFixedKeysFollowThePayloadInTheirOrder) {
                                             "_internal", "_reportVers", "_timezoneOffset"}));
 }
 
+TEST_F(RecordMakerTest, KnowsTheKeysThatItSetsFromOthers) {
+  facts_.hardwareType = facts_.productFamily = facts_.productVersion = facts_.buildVersion = String("known");
+  for (const DictionaryEntry& entry : record()) EXPECT_TRUE(isRecordKey(entry.key.view())) << entry.key.str();
+  for (const char* other : {"", "_", "_mine", "method", "eventtime", "_METHOD", "ClientName"})
+    EXPECT_FALSE(isRecordKey(other)) << other;
+}
+
 TEST_F(RecordMakerTest, SaysWhatItIsTold) {
   const Dictionary made = record();
   EXPECT_EQ(*made.find("_startTS"), Value(1000000080));
