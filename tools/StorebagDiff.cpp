@@ -123,14 +123,6 @@ void addRules(const std::string& where, const Dictionary& before, const Dictiona
       addRule(where, entry.key.str(), &entry.value, nullptr, out);
 }
 
-// Whom a client entry is for.
-std::string entryName(const Dictionary& entry) {
-  std::string text = "client " + (entry.contains("client") ? shown(entry.find("client")) : "any");
-  if (entry.contains("service")) text += ", service " + shown(entry.find("service"));
-  if (entry.contains("enabledSince")) text += ", since " + shown(entry.find("enabledSince"));
-  return text;
-}
-
 struct Entry {
   std::string name;  // with a number where several have the same
   Dictionary rules;
@@ -143,7 +135,7 @@ std::vector<Entry> entriesOf(const Dictionary& profile) {
   std::vector<std::string> seen;
   for (const Value& element : *clients) {
     const Dictionary* entry = element.dictionary();
-    std::string name = entry != nullptr ? entryName(*entry) : "an entry that is no dictionary";
+    std::string name = entry != nullptr ? storebagEntryName(*entry) : "an entry that is no dictionary";
     const auto same = std::count(seen.begin(), seen.end(), name);
     seen.push_back(name);
     if (same != 0) name += " (its entry " + std::to_string(same + 1) + ")";
@@ -209,6 +201,13 @@ void addSection(const std::string& section, const Dictionary& before, const Dict
 }
 
 }  // namespace
+
+std::string storebagEntryName(const Dictionary& entry) {
+  std::string text = "client " + (entry.contains("client") ? shown(entry.find("client")) : "any");
+  if (entry.contains("service")) text += ", service " + shown(entry.find("service"));
+  if (entry.contains("enabledSince")) text += ", since " + shown(entry.find("enabledSince"));
+  return text;
+}
 
 std::vector<std::string> storebagChanges(const Dictionary& before, const Dictionary& after) {
   Lines out;

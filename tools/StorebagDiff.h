@@ -13,4 +13,7 @@ namespace kyt::tools {
 // they are for the same client, service and version.
 [[nodiscard]] std::vector<std::string> storebagChanges(const Dictionary& before, const Dictionary& after);
 
+// Whom a client entry is for, as findings about it name it: client "a", service "b", since "8.0".
+[[nodiscard]] std::string storebagEntryName(const Dictionary& entry);
+
 }  // namespace kyt::tools

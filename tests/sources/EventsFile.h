@@ -6,7 +6,8 @@
 #include <utility>
 #include <variant>
 
-#include "platform/linux/toml/Toml.h"
+#include "platform/objects/Value.h"
+#include "tools/events/EventsFile.h"
 
 namespace kyt {
 
@@ -15,17 +16,14 @@ using FieldNames = std::set<std::string>;
 // The fields of the event with these numbers; none where there is no such event. Personal fields count as "personal!".
 inline FieldNames declaredFields(const std::string& source, uint32_t category, uint32_t type) {
   FieldNames names;
-  const auto read = readToml(std::string(KYT_SOURCE_DIR) + "/sources/" + source + "/events.toml");
-  const auto* table = std::get_if<TomlTable>(&read);
-  if (table == nullptr || !table->contains("event")) return names;
-  for (const TomlNode& event : *table->at("event").array()) {
-    const TomlTable& entry = *event.table();
-    if (std::get<int64_t>(entry.at("category").value) != category ||
-        std::get<int64_t>(entry.at("type").value) != type)
-      continue;
-    for (const auto& [name, field] : *entry.at("fields").table()) {
-      names.insert(name);
-      if (std::get<bool>(field.table()->at("personal").value)) names.insert("personal!");
+  const auto read = tools::readEvents(std::string(KYT_SOURCE_DIR) + "/sources/" + source + "/events.toml");
+  const auto* file = std::get_if<tools::EventsFile>(&read);
+  if (file == nullptr) return names;
+  for (const tools::DeclaredEvent& event : file->events) {
+    if (event.category != category || event.type != type) continue;
+    for (const tools::EventField& field : event.fields) {
+      names.insert(field.name);
+      if (field.personal) names.insert("personal!");
     }
   }
   return names;

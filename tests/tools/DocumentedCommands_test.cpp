@@ -69,6 +69,21 @@ TEST_F(TryingIt, TheCommandsDeliver) {
   EXPECT_TRUE(arrive("client=example&service=demo&method=10&status=1", 1)) << run.text;
 }
 
+TEST(EventsWithNames, TheCommandsTellWhetherTheStorebagFits) {
+  const TemporaryFolder folder;
+  folder.write("events.toml", blockOf("PROGRAMS.md", "toml example=events"));
+  const std::string bag = exampleOf("kytreportingd-storebag.5", "storebag"), hashed = "\"sha256\"";
+  folder.write("bag.toml", bag);
+  const std::string commands = blockOf("PROGRAMS.md", "sh example=events");
+  const ProgramRun fits = shell(folder.path(), commands);
+  EXPECT_EQ(fits.status, 0) << fits.text;
+  ASSERT_NE(bag.find(hashed), std::string::npos);
+  folder.write("bag.toml", std::string(bag).replace(bag.find(hashed), hashed.size(), "\"keep\""));
+  const ProgramRun gap = shell(folder.path(), commands);
+  EXPECT_EQ(gap.status, 1);
+  EXPECT_NE(gap.text.find("personal-unfiltered: \"account\""), std::string::npos) << gap.text;
+}
+
 TEST(TestingAProgram, TheCommandsShowWhatItTold) {
   const TemporaryFolder folder;
   folder.write("script.jsonl", blockOf("PROGRAMS.md", "jsonl example=script"));

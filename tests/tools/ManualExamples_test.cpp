@@ -135,6 +135,16 @@ TEST_F(ManualExamplesOnAStage, OfTheStorebagRun) {
   EXPECT_EQ(run.text.find("warning"), std::string::npos) << run.text;
 }
 
+TEST_F(ManualExamplesOnAStage, OfWhatAProgramReportsRun) {
+  for (const auto& [name, text] :
+       {std::pair("events.toml", exampleOf("kytreporting-events.toml.5", "events")),
+        std::pair("dulvek.toml", exampleOf("kytreportingd-storebag.5", "storebag"))})
+    ASSERT_FALSE(tools::writeFile(stage_->folder() + "/" + name, text, 0644));
+  const ProgramRun check = shell(exampleOf("kytreporting-events.toml.5", "sh check"));
+  EXPECT_EQ(check.status, 0) << check.text;
+  EXPECT_EQ(check.text, "events.toml: nothing found in 1 events with 3 fields\n");
+}
+
 TEST_F(ManualExamplesOnAStage, OfTheFeedRuns) {
   const std::string port = std::to_string(stage_->udpPort());
   const ProgramRun run = shell(

@@ -2,10 +2,12 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <span>
 
 #include "platform/base/Counters.h"
 #include "platform/linux/toml/TomlSettings.h"
 #include "tests/tools/ManualText.h"
+#include "tools/events/EventsFile.h"
 
 namespace kyt {
 namespace {
@@ -126,6 +128,21 @@ TEST(ManualOfKytctl, NamesEachStepOfAScriptedSession) {
   EXPECT_EQ(matchesIn(itemsOf(sectionOf("kytctl.1", "kytctl session")), "\\.It Ic ([A-Za-z]+)"), steps);
   const std::string help = runProgram(KYT_PROGRAMS "/kytctl", {"session", "--help"}).text;
   EXPECT_EQ(matchesIn(help, "\"do\":\"([A-Za-z]+)\""), steps);
+}
+
+TEST(ManualOfEvents, NamesEachKeyTypeAndKindOfFinding) {
+  const std::string page = "kytreporting-events.toml.5";
+  const auto keysOf = [&page](const char* title) {
+    return matchesIn(itemsOf(sectionOf(page, title)), "(?:Ic|,) ([a-z]+)");
+  };
+  const auto names = [](std::span<const std::string> known) { return Names(known.begin(), known.end()); };
+  const tools::EventKeys& keys = tools::eventKeys();
+  EXPECT_EQ(keysOf("The file"), names(keys.ofFile));
+  EXPECT_EQ(keysOf("An event"), names(keys.ofEvent));
+  EXPECT_EQ(keysOf("A field"), names(keys.ofField));
+  EXPECT_EQ(matchesIn(sectionOf(page, "A field"), "\\.Ql ([a-z]+)"), names(keys.types));
+  EXPECT_EQ(matchesIn(itemsOf(sectionOf(page, "What check finds")), "Li ([a-z0-9-]+)"),
+            matchesIn(textOf("tools/events/EventsCheck.h"), "\"([a-z]+-[a-z0-9-]+|replaced)\""));
 }
 
 // The settings: the code, the page and the administrator's guide.

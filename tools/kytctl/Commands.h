@@ -102,6 +102,12 @@ struct OutboxDropOptions {
   bool json = false;
 };
 
+struct EventsOptions {
+  std::string file;  // events.toml
+  std::string bag;   // a document, or a bag: .json, .toml or .plist
+  bool json = false;
+};
+
 struct SimulateOptions {
   std::string bag, events;  // files
   uint32_t devices = 1000;
@@ -154,6 +160,9 @@ struct SimulateOptions {
 [[nodiscard]] int probeCommand(const std::string& root, const ProbeOptions& options);
 // Tells in which of a hundred rings a device is, and lets it ask its ring's address from now on.
 [[nodiscard]] int ringCommand(const std::string& root, const RingOptions& options);
+
+// Tells what a program reports that a bag leaves unguarded or does not take: 0 nothing, 1 something; 2: that cannot be told.
+[[nodiscard]] int checkEventsCommand(const EventsOptions& options);
 
 // Tells how many sessions and events of many devices leave by that bag.
 [[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);

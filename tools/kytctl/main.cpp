@@ -26,6 +26,7 @@ struct Arguments {
   CheckOptions check;
   ExplainOptions explain;
   SimulateOptions simulate;
+  EventsOptions events;
   PublishOptions publish;
   ProbeOptions probe;
   RingOptions ring;
@@ -83,6 +84,11 @@ constexpr char kSimulated[] =
   {"do":"devices","countries":{"DE":3,"unknown":1},"families":{"Phone":1},"models":{"P1":1},"consent":0.8}
 and "perDay" of a step "open" is how many such sessions a device has each day. What is not said is what the bag
 names, in equal shares, and one that it does not name; the consent is given then.)";
+
+constexpr char kEventsChecked[] =
+    R"(Findings are lines FILE:LINE: KIND: TEXT. The kinds: personal-unfiltered, category-refused, category-0, not-posted,
+replaced, client-not-listed. Consent, countries, devices and sampling are not looked at: kytctl storebag simulate does.
+The exit status is 0 without findings, 1 with some, and 2 when the file or the bag cannot be read.)";
 
 void addConnectionOptions(const Command& command, Arguments& arguments) {
   command.option("--socket", arguments.connection.socket, "The daemon's socket, instead of the fixed one");
@@ -290,6 +296,17 @@ void addStorebag(const Command& program, Arguments& a) {
   addRollOut(program, bag, a);
 }
 
+void addEvents(const Command& program, Arguments& a) {
+  const Command events = program.command("events", "What a program reports, as its events.toml says");
+  events.needsCommand();
+  const Command check = events.command("check", "Tell what a bag leaves unguarded of it, or does not take");
+  check.option("file", a.events.file, "What the program reports, events.toml").required();
+  check.option("bag", a.events.bag, "A document, or a bag (.json, .toml or .plist)").required();
+  check.flag("--json", a.events.json, "Print one JSON object");
+  check.ends(kEventsChecked);
+  check.runs([&a] { a.status = checkEventsCommand(a.events); });
+}
+
 void addWindow(const Command& program, Arguments& a) {
   using Print = int (*)(const std::string&, bool);
   const std::tuple<const char*, const char*, Print> commands[] = {
@@ -361,6 +378,7 @@ int main(int argc, char** argv) {
   addOwner(program, arguments);
   addEntitlements(program, arguments);
   addStorebag(program, arguments);
+  addEvents(program, arguments);
   addWindow(program, arguments);
   addOutbox(program, arguments);
   if (const auto status = program.parse(argc, argv)) return *status;

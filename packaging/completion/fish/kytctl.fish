@@ -73,6 +73,7 @@ complete -c kytctl -n __kytctl_at -a owner -d 'What left the device'
 complete -c kytctl -n __kytctl_at -a entitlements -d 'Who may connect'
 complete -c kytctl -n __kytctl_at -a keys -d 'Keys for signing storebags'
 complete -c kytctl -n __kytctl_at -a storebag -d 'Signed configurations'
+complete -c kytctl -n __kytctl_at -a events -d 'What a program reports'
 complete -c kytctl -n __kytctl_at -a status -d 'How the running daemon stands'
 complete -c kytctl -n __kytctl_at -a sessions -d 'The sessions of the running daemon'
 complete -c kytctl -n __kytctl_at -a books -d 'What became of events'
@@ -105,6 +106,7 @@ complete -c kytctl -n '__kytctl_at owner' -a 'show export erase'
 complete -c kytctl -n '__kytctl_at -b owner show' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
+complete -c kytctl -n '__kytctl_at events' -a check
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate publish diff probe'
 
 complete -c kytctl -n '__kytctl_at -b listen' -l socket -r -F -d 'Where to listen'
@@ -169,3 +171,6 @@ complete -c kytctl -n '__kytctl_at -b storebag simulate' -l seed -x -d 'The same
 complete -c kytctl -n '__kytctl_at -b storebag simulate' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show" "storebag simulate" "storebag publish" "storebag diff"' -F
 complete -c kytctl -n '__kytctl_due 2 "storebag diff"' -F
+complete -c kytctl -n '__kytctl_at -b events check' -l json -d 'Print JSON'
+complete -c kytctl -n '__kytctl_due 1 "events check"' -F
+complete -c kytctl -n '__kytctl_due 2 "events check"' -F

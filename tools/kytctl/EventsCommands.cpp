@@ -1,0 +1,83 @@
+// What a program reports, as its events.toml says.
+#include <cstdio>
+#include <utility>
+#include <variant>
+
+#include "platform/base/TextEscape.h"
+#include "tools/StorebagFile.h"
+#include "tools/events/EventsCheck.h"
+#include "tools/events/EventsFile.h"
+#include "tools/kytctl/Commands.h"
+#include "tools/kytctl/StorebagServices.h"
+
+namespace kyt::tools {
+
+namespace {
+
+constexpr int kCannotTell = 2;
+
+// Says what is wrong with the file.
+void tell(const EventsProblems& problems) {
+  for (const TomlError& problem : problems) std::fprintf(stderr, "kytctl: %s\n", problem.text.c_str());
+}
+
+size_t numberOfFields(const EventsFile& file) {
+  size_t number = 0;
+  for (const DeclaredEvent& event : file.events) number += event.fields.size();
+  return number;
+}
+
+void print(const EventsFile& file, const EventsVerdict& verdict) {
+  for (const EventFinding& finding : verdict.findings) {
+    const std::string line = finding.line != 0 ? ":" + std::to_string(finding.line) : "";
+    std::printf("%s%s: %s: %s\n", escapedText(file.name).c_str(), line.c_str(), finding.kind.c_str(),
+                finding.text.c_str());
+  }
+  if (verdict.further != 0)
+    std::printf("%s: and %zu more\n", escapedText(file.name).c_str(), verdict.further);
+  if (verdict.findings.empty())
+    std::printf("%s: nothing found in %zu events with %zu fields\n", escapedText(file.name).c_str(),
+                file.events.size(), numberOfFields(file));
+}
+
+void printJSON(JSON& json, const EventsFile& file, const std::string& bag, const EventsVerdict& verdict) {
+  Array findings;
+  for (const EventFinding& finding : verdict.findings) {
+    Dictionary row{{"line", unsigned{finding.line}}, {"kind", finding.kind}};
+    if (!finding.event.empty()) row.set("event", finding.event);
+    if (!finding.field.empty()) row.set("field", finding.field);
+    row.set("text", finding.text);
+    findings.append(std::move(row));
+  }
+  const Dictionary report{{"file", escapedText(file.name)}, {"storebag", escapedText(bag)},
+                          {"events", file.events.size()},   {"fields", numberOfFields(file)},
+                          {"findings", findings},           {"further", verdict.further}};
+  std::string text;
+  json.writePretty(report, text);
+  std::printf("%s\n", text.c_str());
+}
+
+}  // namespace
+
+int checkEventsCommand(const EventsOptions& options) {
+  const auto read = readEvents(options.file);
+  if (const auto* problems = std::get_if<EventsProblems>(&read)) {
+    tell(*problems);
+    return kCannotTell;
+  }
+  StorebagServices services;
+  const auto bag = services.file.openOrRead(options.bag);
+  if (const auto* error = std::get_if<Error>(&bag)) {
+    failed(*error);
+    return kCannotTell;
+  }
+  const EventsFile& file = std::get<EventsFile>(read);
+  const EventsVerdict verdict = checkEvents(file, std::get<Dictionary>(bag));
+  if (options.json)
+    printJSON(services.json, file, options.bag, verdict);
+  else
+    print(file, verdict);
+  return verdict.findings.empty() ? 0 : 1;
+}
+
+}  // namespace kyt::tools
