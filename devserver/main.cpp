@@ -150,7 +150,7 @@ int serve(const Options& options, const sigset_t& signals) {
   Router router(options, *store, checker, stream, suspensions, acknowledgements, signer);
   ServerOptions port = {options.listen, options.httpsPort};
   port.maxConnections = options.maxConnections;
-  port.requestTime = options.requestTimeout;
+  port.requestTime = port.idleTime = options.requestTimeout;
   const auto https = HttpServer::start(port, &std::get<Identity>(identity), router, suspensions, error);
   port.port = options.httpPort;
   const auto http = https ? HttpServer::start(port, nullptr, router, suspensions, error) : nullptr;

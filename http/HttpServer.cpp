@@ -294,7 +294,7 @@ std::unique_ptr<HttpServer> HttpServer::start(const ServerOptions& options, cons
   server->daemon_ = MHD_start_daemon(
       flags, options.port, nullptr, nullptr, &HttpServer::onRequest, server.get(), MHD_OPTION_LISTEN_SOCKET,
       listener, MHD_OPTION_ARRAY, more.data(), MHD_OPTION_CONNECTION_LIMIT, options.maxConnections,
-      MHD_OPTION_CONNECTION_TIMEOUT, static_cast<unsigned>(options.requestTime.count()),
+      MHD_OPTION_CONNECTION_TIMEOUT, static_cast<unsigned>(options.idleTime.count()),
       MHD_OPTION_NOTIFY_COMPLETED, &HttpServer::onEnd, server.get(), MHD_OPTION_NOTIFY_CONNECTION,
       &HttpServer::onConnection, server.get(), MHD_OPTION_END);
   if (server->daemon_ == nullptr) {

@@ -29,7 +29,8 @@ struct ServerOptions {
   uint16_t port = 0;                       // 0: any free one
   unsigned threads = 2;                    // at least 1
   unsigned maxConnections = 4096;          // further ones wait to be accepted
-  std::chrono::seconds requestTime{60};    // for a body to be whole; and a connection without a byte ends
+  std::chrono::seconds requestTime{60};    // for a body to be whole
+  std::chrono::seconds idleTime{60};       // a connection without a byte ends
   uint64_t maxBodiesBytes = ~uint64_t{0};  // of all requests that are not yet answered
 };
 

@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -48,8 +49,8 @@ class EventLog {
   virtual void publish(uint64_t token, std::shared_ptr<const LogMessage> message) = 0;
   // Into the dead-letter stream. Nobody waits for an answer.
   virtual void publishDeadLetter(std::shared_ptr<const LogMessage> message) = 0;
-  // Bytes of body that a message may have; ~0 where that is not known.
-  [[nodiscard]] virtual uint64_t maxBodyBytes() const = 0;
+  // Bytes of body that a message may have; none: that is not known yet.
+  [[nodiscard]] virtual std::optional<uint64_t> maxBodyBytes() const = 0;
   // No listener is called any more once this has returned.
   virtual void stop() = 0;
 };

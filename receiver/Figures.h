@@ -18,6 +18,7 @@ enum class Refusal : uint8_t {
   empty,
   tooLarge,
   tooLargeForLog,
+  logLimitUnknown,
   wrongEncoding,
   notGzip,
   notJSON,

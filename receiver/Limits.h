@@ -14,9 +14,9 @@ struct Limits {
   // Connections of the posts' port: descriptors. Further ones wait to be accepted.
   static constexpr unsigned maxConnections = 8192;
   static constexpr unsigned maxMetricsConnections = 16;
-  // A connection without a request's headers. Longer than proxies keep their connections to us (nginx: 60 s), so that
-  // it is them who end an idle one, and never with a post on its way.
-  static constexpr std::chrono::seconds idleTime{75};
+  // A body that any log takes, as NATS and Kafka are by default: 1 MiB with its headers. A larger one is refused for now
+  // while nobody knows what this log takes; the spool could keep it for ever.
+  static constexpr uint64_t surelyTakenBytes = (uint64_t{1} << 20) - 8192;
   // For posts that are in progress when the process is told to end: the body's rest, and its way to log or spool.
   static constexpr std::chrono::seconds drainTime{15};
   // … and for a proxy's next post on a connection that it has open: it learns with the answer that the connection ends.

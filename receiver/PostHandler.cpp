@@ -68,7 +68,7 @@ std::optional<Reply> PostHandler::refusal(const Request& request) const {
 }
 
 uint64_t PostHandler::bodyLimit(const Request& /*request*/) const {
-  return std::min(settings_.maxBodyBytes, log_.maxBodyBytes());
+  return std::min(settings_.maxBodyBytes, log_.maxBodyBytes().value_or(settings_.maxBodyBytes));
 }
 
 Reply PostHandler::replyFor(Fate fate, uint64_t bytes, bool hasDigest) const {
@@ -114,6 +114,8 @@ void PostHandler::open(Request& request, bool hasDigest, const std::shared_ptr<L
 Answer PostHandler::answer(Request& request) {
   bool hasDigest = false;
   if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
+  if (request.body.size() > Limits::surelyTakenBytes && !log_.maxBodyBytes())
+    return refuse(Refusal::logLimitUnknown, "how large a body the log takes is not known yet");
   if (isClosed_) return refuse(Refusal::stopping, "this receiver is about to end");
   auto later = std::make_shared<LaterReply>();
   ++waiting_;

@@ -4,6 +4,7 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <csignal>
@@ -121,6 +122,7 @@ bool writeReadyFile(const std::string& file, const HttpServer& posts, const Http
   return false;
 }
 
+// Settings count from the start on: a restart takes up others, and loses no post.
 void waitForEnd(StopSignals& signals) {
   while (signals.wait() == SIGHUP) {
   }
@@ -143,12 +145,14 @@ void drain(HttpServer& server, PostHandler& handler, Log& lines) {
 }
 
 http::ServerOptions serverOptions(const ListenAddress& address, unsigned maxConnections,
-                                  std::chrono::seconds bodyTime) {
+                                  const Settings& settings) {
   http::ServerOptions options;
   options.address = address.address;
   options.port = address.port;
   options.maxConnections = maxConnections;
-  options.requestTime = bodyTime;
+  options.requestTime = settings.bodyTime;
+  // What ends slow connections looks 20 times a second; the server itself is the later one.
+  options.idleTime = std::max(settings.idleTime, settings.bodyTime) + std::chrono::seconds(5);
   return options;
 }
 
@@ -173,7 +177,7 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   http::Suspensions suspensions([] {});
 
   std::string error;
-  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings.bodyTime);
+  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings);
   portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
   auto server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
   if (!server) return lines.error("start: %s", error.c_str()), 1;
@@ -181,7 +185,7 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   std::unique_ptr<HttpServer> metrics;
   if (settings.metrics) {
     http::ServerOptions metricsOptions =
-        serverOptions(*settings.metrics, Limits::maxMetricsConnections, settings.bodyTime);
+        serverOptions(*settings.metrics, Limits::maxMetricsConnections, settings);
     metricsOptions.threads = 1;
     metrics = HttpServer::start(metricsOptions, nullptr, metricsHandler, suspensions, error);
     if (!metrics) return lines.error("start: %s", error.c_str()), 1;
@@ -191,8 +195,8 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   auto ticker = std::make_unique<Ticker>([&] {
     delivery.tick();
     spool.tick();
-    server->endSlowConnections(Limits::idleTime);
-    if (metrics) metrics->endSlowConnections(Limits::idleTime);
+    server->endSlowConnections(settings.idleTime);
+    if (metrics) metrics->endSlowConnections(settings.idleTime);
   });
   int status = writeReadyFile(options.readyFile, *server, metrics.get(), lines) ? 0 : 1;
   if (status == 0) {

@@ -118,7 +118,11 @@ class Reading {
       int64_t seconds = settings_.bodyTime.count();
       section.count("body_seconds", seconds, 1, 3600);
       settings_.bodyTime = std::chrono::seconds(seconds);
+      seconds = settings_.idleTime.count();
+      section.count("idle_seconds", seconds, 1, 86400);
+      settings_.idleTime = std::chrono::seconds(seconds);
     });
+    settings_.log.maxBodyBytes = settings_.maxBodyBytes;
     paths(top);
     top.end();
     if (!errors_.empty()) return SettingsErrors{std::move(errors_)};

@@ -29,6 +29,7 @@ struct LogSettings {
   std::chrono::milliseconds publishTime{2000};  // then a post goes to the spool
   std::string caFile;                           // of the log's servers, for TLS; empty: the system's
   std::string credentials;                      // file of credentials; empty: none
+  uint64_t maxBodyBytes = 17825792;             // of the posts that come: a log that takes less is said to
   // What --make-streams makes.
   int replicas = 1;
   int64_t maxBytes = -1;  // of each stream; -1: no limit
@@ -52,6 +53,9 @@ struct Settings {
   uint64_t spoolMaxBytes = uint64_t{1} << 30;
   uint64_t maxBodyBytes = 17825792;
   std::chrono::seconds bodyTime{60};  // for a post to be whole: a slow device holds a connection no longer
+  // A connection without a request's headers. Longer than proxies keep their connections to us (nginx: 60 s), so that it
+  // is them who end an idle one, and never with a post on its way.
+  std::chrono::seconds idleTime{75};
   std::vector<PathSettings> paths;
 };
 

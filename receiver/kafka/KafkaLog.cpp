@@ -100,7 +100,7 @@ void KafkaLog::start(LogListener& listener) {
   thread_ = std::thread([this] { run(); });
 }
 
-uint64_t KafkaLog::maxBodyBytes() const {
+std::optional<uint64_t> KafkaLog::maxBodyBytes() const {
   return kMaxMessageBytes - kHeaderRoom;
 }
 

@@ -32,7 +32,7 @@ class KafkaLog final : public EventLog {
   void start(LogListener& listener) override;
   void publish(uint64_t token, std::shared_ptr<const LogMessage> message) override;
   void publishDeadLetter(std::shared_ptr<const LogMessage> message) override;
-  [[nodiscard]] uint64_t maxBodyBytes() const override;
+  [[nodiscard]] std::optional<uint64_t> maxBodyBytes() const override;
   void stop() override;
 
  private:

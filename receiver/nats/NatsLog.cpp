@@ -189,6 +189,11 @@ bool NatsLog::connect() {
   return true;
 }
 
+std::optional<uint64_t> NatsLog::maxBodyBytes() const {
+  const uint64_t bytes = maxBodyBytes_.load();
+  return bytes == kUnknown ? std::nullopt : std::optional(bytes);
+}
+
 void NatsLog::noteConnected(natsConnection* connection) {
   const int64_t payload = natsConnection_GetMaxPayload(connection);
   maxBodyBytes_ = payload > kHeaderRoom ? static_cast<uint64_t>(payload - kHeaderRoom) : 0;
@@ -196,6 +201,12 @@ void NatsLog::noteConnected(natsConnection* connection) {
   natsConnection_GetConnectedUrl(connection, url, sizeof url);
   lines_.normal("log: connected to %s, which takes messages of %lld bytes", escapedText(url).c_str(),
                 static_cast<long long>(payload));
+  if (maxBodyBytes_ < settings_.maxBodyBytes)
+    lines_.error(
+        "log: posts over %llu bytes are refused, since its servers' max_payload is smaller than "
+        "limits.max_body_bytes (%llu) and 8192",
+        static_cast<unsigned long long>(maxBodyBytes_.load()),
+        static_cast<unsigned long long>(settings_.maxBodyBytes));
   hasStream_ = false;
   isConnected_ = true;
 }

@@ -35,13 +35,14 @@ class NatsLog final : public EventLog {
   void start(LogListener& listener) override;
   void publish(uint64_t token, std::shared_ptr<const LogMessage> message) override EXCLUDES(mutex_);
   void publishDeadLetter(std::shared_ptr<const LogMessage> message) override EXCLUDES(mutex_);
-  [[nodiscard]] uint64_t maxBodyBytes() const override { return maxBodyBytes_.load(); }
+  [[nodiscard]] std::optional<uint64_t> maxBodyBytes() const override;
   void stop() override EXCLUDES(mutex_);
 
   // Makes the two streams, or says why that failed; nothing happens to one that is there. Blocks; without start().
   [[nodiscard]] std::optional<std::string> makeStreams();
 
  private:
+  static constexpr uint64_t kUnknown = ~uint64_t{0};
   struct Item {
     uint64_t token = 0;  // 0: a dead letter
     std::shared_ptr<const LogMessage> message;
@@ -87,7 +88,7 @@ class NatsLog final : public EventLog {
   std::string inbox_;
   Owned<natsConnection> connection_;
   Owned<natsSubscription> subscription_;
-  std::atomic<uint64_t> maxBodyBytes_{~uint64_t{0}};
+  std::atomic<uint64_t> maxBodyBytes_{kUnknown};
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
   std::atomic<bool> isMissingTold_{false};

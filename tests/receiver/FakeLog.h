@@ -44,7 +44,7 @@ class FakeLog final : public EventLog {
     MutexLock lock(mutex_);
     deadLetters_.push_back(std::move(message));
   }
-  [[nodiscard]] uint64_t maxBodyBytes() const override { return ~uint64_t{0}; }
+  [[nodiscard]] std::optional<uint64_t> maxBodyBytes() const override { return 1 << 20; }
   void stop() override {}
 
   void setMood(Mood mood) { mood_ = mood; }

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <optional>
+#include <utility>
 
 #include "tests/receiver/NatsServer.h"
 #include "tests/receiver/ReceiverProcess.h"
@@ -13,6 +14,7 @@ namespace kyt::receiver {
 
 class ReceiverTest : public ::testing::Test {
  protected:
+  explicit ReceiverTest(NatsServers::Options options = {}) : servers_(std::move(options)) {}
   void SetUp() override {
     if (!NatsServers::isInstalled()) GTEST_SKIP() << "nats-server is not installed";
     servers_.start();

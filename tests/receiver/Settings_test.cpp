@@ -32,6 +32,7 @@ TEST(ReceiverSettings, HaveDefaultsForAllButLogSpoolAndPath) {
   EXPECT_EQ(settings.spoolMaxBytes, 1073741824U);
   EXPECT_EQ(settings.maxBodyBytes, 17825792U);
   EXPECT_EQ(settings.bodyTime, std::chrono::seconds(60));
+  EXPECT_EQ(settings.idleTime, std::chrono::seconds(75));
   EXPECT_EQ(settings.paths.at(0).digest, DigestPolicy::none);
 }
 
@@ -56,6 +57,7 @@ max_bytes = 2097152
 [limits]
 max_body_bytes = 4096
 body_seconds = 5
+idle_seconds = 7
 [[path]]
 url_path = "/a"
 digest = "required"
@@ -82,6 +84,7 @@ digest = "optional"
   EXPECT_EQ(settings.spoolMaxBytes, 2097152U);
   EXPECT_EQ(settings.maxBodyBytes, 4096U);
   EXPECT_EQ(settings.bodyTime, std::chrono::seconds(5));
+  EXPECT_EQ(settings.idleTime, std::chrono::seconds(7));
   ASSERT_EQ(settings.paths.size(), 2U);
   EXPECT_EQ(settings.paths[0].digest, DigestPolicy::required);
   EXPECT_EQ(settings.paths[0].digestKeys.at("QPW/videocall"),

@@ -1,12 +1,16 @@
 // What goes wrong around a receiver: hostile posts, processes that die, a log and a disk that are full.
+#include <signal.h>
+
 #include <algorithm>
 #include <atomic>
 #include <cstdio>
 #include <fstream>
 #include <map>
+#include <memory>
 #include <set>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "tests/receiver/Load.h"
 #include "tests/receiver/ReceiverTest.h"
@@ -32,6 +36,13 @@ class ReceiverInTrouble : public ReceiverTest {
     }
     return most;
   }
+  void expectOthersAreServed() {
+    for (uint64_t i = 0; i < 50; ++i) {
+      const HttpReply reply = receiver_->post(postText(i));
+      EXPECT_EQ(reply.status, 200);
+      EXPECT_LT(reply.took, std::chrono::seconds(1));
+    }
+  }
   [[nodiscard]] uint16_t serverPort() const {
     const std::string url = servers_.url(0);
     return static_cast<uint16_t>(std::stoi(url.substr(url.rfind(':') + 1)));
@@ -54,30 +65,117 @@ TEST_F(ReceiverInTrouble, OpensPostsWhereItIsToldToAndRefusesBombsAndWrongJSON) 
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-gzip\"}"), 2);
 }
 
-TEST_F(ReceiverInTrouble, ASlowBodyOrSlowHeadersAreCutOffAndSlowNobodyElse) {
+// Sends a byte now and then until the other side ends the connection or this object ends.
+class Dribble {
+ public:
+  Dribble(uint16_t port, const std::string& beginning) : connection_(port) {
+    connection_.send(beginning);
+    thread_ = std::thread([this] {
+      while (!isOver_ && connection_.send("x")) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    });
+  }
+  ~Dribble() {
+    isOver_ = true;
+    thread_.join();
+  }
+  Dribble(const Dribble&) = delete;
+  Dribble& operator=(const Dribble&) = delete;
+  [[nodiscard]] bool isCutOff() { return connection_.isClosed(); }
+
+ private:
+  HttpConnection connection_;
+  std::atomic<bool> isOver_{false};
+  std::thread thread_;
+};
+
+TEST_F(ReceiverInTrouble, ASlowBodyIsCutOffAndSlowsNobodyElse) {
   ReceiverProcess::Options options;
   options.limits = "body_seconds = 2\n";
   start(options);
   // One is silent, one sends a byte now and then: neither is whole in time.
-  HttpConnection silent(receiver_->port()), dribbling(receiver_->port());
-  for (HttpConnection* connection : {&silent, &dribbling})
-    connection->send("POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: 100000\r\n\r\n{");
-  std::atomic<bool> isOver{false};
-  std::thread bytes([&] {
-    while (!isOver && dribbling.send("x")) std::this_thread::sleep_for(std::chrono::milliseconds(100));
-  });
-  for (uint64_t i = 0; i < 50; ++i) {
-    const HttpReply reply = receiver_->post(postText(i));
-    EXPECT_EQ(reply.status, 200);
-    EXPECT_LT(reply.took, std::chrono::seconds(1));
-  }
+  const std::string beginning = "POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: 100000\r\n\r\n{";
+  HttpConnection silent(receiver_->port());
+  silent.send(beginning);
+  Dribble dribbling(receiver_->port(), beginning);
+  expectOthersAreServed();
   EXPECT_TRUE(silent.isClosed());
-  EXPECT_TRUE(dribbling.isClosed());
-  isOver = true;
-  bytes.join();
+  EXPECT_TRUE(dribbling.isCutOff());
   EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_refused_total{reason=\"too-slow\"}") == 2; }))
       << receiver_->get("/metrics").body;
   EXPECT_EQ(view_->messages(), 50U);
+}
+
+TEST_F(ReceiverInTrouble, SlowHeadersAreCutOffAndSlowNobodyElse) {
+  ReceiverProcess::Options options;
+  options.limits = "idle_seconds = 2\n";
+  start(options);
+  const auto begun = std::chrono::steady_clock::now();
+  HttpConnection mute(receiver_->port());
+  std::vector<std::unique_ptr<Dribble>> dribbling;
+  for (int i = 0; i < 20; ++i)
+    dribbling.push_back(
+        std::make_unique<Dribble>(receiver_->port(), "POST /v1/events HTTP/1.1\r\nHost: t\r\nX-Slow: "));
+  expectOthersAreServed();
+  for (const auto& one : dribbling) EXPECT_TRUE(one->isCutOff());
+  EXPECT_TRUE(mute.isClosed());
+  EXPECT_GE(std::chrono::steady_clock::now() - begun, std::chrono::seconds(2));
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_connections") == 0; }));
+  EXPECT_EQ(view_->messages(), 50U);
+}
+
+TEST_F(ReceiverInTrouble, AnIdleConnectionOutlivesTheTimeOfABody) {
+  ReceiverProcess::Options options;
+  options.limits = "body_seconds = 1\n";
+  start(options);
+  HttpConnection front(receiver_->port());
+  EXPECT_EQ(front.post("/v1/events", postText(1)).status, 200);
+  EXPECT_FALSE(front.isClosed(std::chrono::milliseconds(3500)));
+  EXPECT_EQ(front.post("/v1/events", postText(2)).status, 200);
+}
+
+TEST_F(ReceiverInTrouble, AHangUpSignalChangesNothing) {
+  start();
+  const int before = receiver_->pid();
+  receiver_->signal(SIGHUP);
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->get("/readyz").status, 200);
+  EXPECT_EQ(receiver_->pid(), before);
+  EXPECT_EQ(receiver_->terminate(), 0) << receiver_->output();
+}
+
+class ReceiverOnASmallLog : public ReceiverTest {
+ protected:
+  ReceiverOnASmallLog() : ReceiverTest({1, "max_payload: 1MB"}) {}
+  static constexpr size_t kTooLarge = 2 << 20, kTaken = 1000 << 10;
+  static constexpr char kTooLargeReason[] = "kyt_refused_total{reason=\"too-large\"}";
+};
+
+TEST_F(ReceiverOnASmallLog, SaysSoAtItsStartAndRefusesWhatThatNeverTakes) {
+  start();
+  EXPECT_NE(receiver_->output().find("posts over 1040384 bytes are refused"), std::string::npos);
+  EXPECT_EQ(receiver_->post(std::string(kTooLarge, 'x')).status, 413);
+  EXPECT_EQ(receiver_->post(std::string(kTaken, 'x')).status, 200);
+  servers_.kill(0);
+  EXPECT_EQ(receiver_->post(std::string(kTooLarge, 'x')).status, 413) << "it knows it still";
+  EXPECT_EQ(receiver_->metric(kTooLargeReason), 2);
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 0);
+}
+
+TEST_F(ReceiverOnASmallLog, KeepsNothingThatTheLogMayNeverTakeBeforeTheLogWasThere) {
+  servers_.kill(0);
+  ReceiverProcess::Options options;
+  options.servers = servers_.urlsAsToml();
+  receiver_.emplace(options);
+  ASSERT_TRUE(receiver_->isReady()) << receiver_->output();
+  EXPECT_EQ(receiver_->post(std::string(kTooLarge, 'x')).status, 429);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"log-limit-unknown\"}"), 1);
+  EXPECT_EQ(receiver_->post(std::string(kTaken, 'x')).status, 200);
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
+  servers_.start(0);
+  start();
+  EXPECT_TRUE(spoolBecomesEmpty());
+  EXPECT_EQ(receiver_->metric("kyt_spool_stuck_total"), 0);
+  EXPECT_EQ(receiver_->post(std::string(kTooLarge, 'x')).status, 413);
 }
 
 TEST_F(ReceiverInTrouble, AConnectionThatEndsInTheMiddleOfAPostIsCounted) {
