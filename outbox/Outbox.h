@@ -164,6 +164,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void turn() REQUIRES(*queue_) EXCLUDES(mutex_);
   void turnIsOver(const Inbox& inbox) REQUIRES(*queue_) EXCLUDES(mutex_);
   void load() REQUIRES(*queue_);
+  void forgetUnreadable(const std::vector<int64_t>& numbers) REQUIRES(*queue_);
   [[nodiscard]] int64_t bornAt(int64_t keptAt) const;
   [[nodiscard]] int64_t seconds() const;
 

@@ -20,8 +20,10 @@ constexpr unsigned kMostDoublings = 6;
 void Outbox::load() {
   if (diskRests()) return;
   std::map<BookRowName, uint64_t> found;
-  const auto problem = ports_.store.open([this, &found](StoredPostHead head) {
+  std::vector<int64_t> unreadable;
+  const auto problem = ports_.store.open([this, &found, &unreadable](StoredPostHead head) {
     queue_->assertCurrent();
+    if (head.isUnreadable) return unreadable.push_back(head.post.number);
     StoredPost& post = head.post;
     for (const auto& [row, count] : post.events) found[row] += count;
     posts_
@@ -41,11 +43,24 @@ void Outbox::load() {
   for (const auto& [row, count] : found) all.push_back({row, count});
   books_.restore(all);
   if (problem) return handle(*problem);
+  forgetUnreadable(unreadable);
   if (posts_.size() == 0) return;
   ports_.log.normal("Outbox: %zu posts of %llu bytes are left from before", posts_.size(),
                     static_cast<unsigned long long>(posts_.bytes()));
   // Devices that start at the same time do not all ask at the same time.
   for (auto& [server, line] : posts_.lines()) fail(line, std::nullopt, true);
+}
+
+// Of these is not even known whose they were.
+void Outbox::forgetUnreadable(const std::vector<int64_t>& numbers) {
+  if (numbers.empty()) return;
+  ports_.counters.add(Reason::outboxPostUnreadable, numbers.size());
+  ports_.log.error("Outbox: Its file is damaged at %zu places, the posts there are lost", numbers.size());
+  constexpr int64_t kGreatest = int64_t{1} << 53;
+  for (const int64_t number : numbers) {
+    if (number != 0) removed_.push_back(number);
+    if (number <= kGreatest) last_ = std::max(last_, number);
+  }
 }
 
 OutboxBooks::Events Outbox::eventsOf(const KeptPosts::Entry& entry) {
@@ -100,6 +115,7 @@ bool Outbox::cannotRead(KeptPosts::Entry& entry, const PostStoreProblem& problem
 
 void Outbox::lose(KeptPosts::Entry& entry, const PostStoreProblem& problem) {
   ports_.log.error("Outbox: A post to %s is lost: %s", entry.line->server.c_str(), problem.text.c_str());
+  ports_.counters.add(Reason::outboxPostUnreadable);
   books_.drop(entry.number, eventsOf(entry), Reason::outboxUnreadable);
   removed_.push_back(entry.number);
   posts_.remove(entry);

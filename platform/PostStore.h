@@ -37,6 +37,7 @@ struct StoredPost {
 struct StoredPostHead {
   StoredPost post;  // without headers and body
   uint64_t bytes = 0;
+  bool isUnreadable = false;  // nothing is known of it but its number; 0: nor that, or how many there are
 };
 
 struct PostStoreProblem {
@@ -57,9 +58,11 @@ class PostStore {
   }
 
   virtual ~PostStore() = default;
-  // Before all else: calls `found` with each post, oldest first. A store that was never written to is not made by this.
+  // Before all else: calls `found` with each post, oldest first; of what is damaged with what is left. A store that was never
+  // written to is not made by this.
   [[nodiscard]] virtual std::optional<PostStoreProblem> open(Function<void(StoredPostHead)> found) = 0;
-  // Adds and removes; numbers that are not there are removed already. `forGood`: what is removed is overwritten too.
+  // Adds and removes; numbers that are not there are removed already, and those that the disk does not give are from now on not
+  // there. `forGood`: what is removed is overwritten too.
   [[nodiscard]] virtual std::optional<PostStoreProblem> change(std::span<const StoredPost* const> added,
                                                                std::span<const int64_t> removed,
                                                                bool forGood) = 0;

@@ -37,6 +37,7 @@ Spool::~Spool() {
 std::optional<std::string> Spool::open() {
   for (bool again : {true, false}) {
     const auto wrong = store_.open([this](StoredPostHead head) {
+      if (head.isUnreadable) return count(figures_.stuck);
       entries_[head.post.number] = {head.bytes, head.post.keptAt};
       lastNumber_ = std::max(lastNumber_, head.post.number);
       bytes_ += head.bytes;

@@ -120,6 +120,8 @@ const char* reasonName(Reason reason) {
       return "post-not-kept";
     case Reason::outboxFileDamaged:
       return "outbox-file-damaged";
+    case Reason::outboxPostUnreadable:
+      return "outbox-post-unreadable";
     case Reason::requestFailed:
       return "request-failed";
     case Reason::requestRefused:

@@ -78,8 +78,9 @@ enum class Reason : uint8_t {
   outboxDropped,           // by the administrator
   outboxUnreadable,        // its file was damaged
   postNotKept,  // a post that failed and that the outbox could not keep; its events are lost as without one
-  outboxFileDamaged,  // times that the outbox's file was set aside
-  requestFailed,      // the posts of events themselves
+  outboxFileDamaged,     // times that the outbox's file was set aside
+  outboxPostUnreadable,  // posts that it had kept and that cannot be read any more
+  requestFailed,         // the posts of events themselves
   requestRefused,
   requestRedirected,
   waitingRequestDisplaced,   // a request dropped while waiting for connectivity

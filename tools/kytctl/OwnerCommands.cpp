@@ -297,7 +297,8 @@ class Owner {
       if (::unlink(one.path.c_str()) != 0 && errno != ENOENT) status = failedAt(one.path);
     bool wasKept = false;
     for (const char* name :
-         {"/outbox.sqlite", "/outbox.sqlite-wal", "/outbox.sqlite-journal", "/outbox.sqlite.damaged"}) {
+         {"/outbox.sqlite", "/outbox.sqlite-wal", "/outbox.sqlite-journal", "/outbox.sqlite.damaged",
+          "/outbox.sqlite.new", "/outbox.sqlite.new-wal", "/outbox.sqlite.new-journal"}) {
       const std::string kept = paths_.outbox() + name;
       if (::unlink(kept.c_str()) == 0)
         wasKept = true;

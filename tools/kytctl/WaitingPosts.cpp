@@ -38,6 +38,7 @@ WaitingPosts readFrom(const Paths& paths) {
   std::map<std::string, WaitingPosts::Server> servers;
   SQLitePostStore store(paths.outbox());
   const auto problem = store.open([&servers](const StoredPostHead& head) {
+    if (head.isUnreadable) return;
     WaitingPosts::Server& server = servers[std::string(serverOf(head.post.url))];
     ++server.posts;
     server.bytes += head.bytes;

@@ -7,6 +7,15 @@ namespace {
 
 constexpr uint64_t kByConsent = 1, kCellular = 2;
 constexpr uint64_t kInternal = 1, kOther = 2;
+constexpr int64_t kLatest = 253402300799;  // the end of the year 9999
+
+uint64_t checksum(std::initializer_list<std::string_view> parts) {
+  constexpr uint64_t kPrime = 1099511628211U;
+  uint64_t sum = 14695981039346656037U;
+  for (const std::string_view part : parts)
+    for (const char c : part) sum = (sum ^ static_cast<unsigned char>(c)) * kPrime;
+  return sum;
+}
 
 class Writer {
  public:
@@ -40,6 +49,11 @@ class Reader {
     }
     isWrong_ = true;
     return 0;
+  }
+  uint32_t number32() {
+    const uint64_t value = number();
+    if (value > UINT32_MAX) isWrong_ = true;
+    return static_cast<uint32_t>(value);
   }
   std::string text() {
     const uint64_t size = number();
@@ -94,7 +108,7 @@ std::optional<StoredPost> readPostRecord(std::string_view record) {
   Reader reader(record);
   StoredPost post;
   post.keptAt = static_cast<int64_t>(reader.number());
-  post.user = static_cast<uint32_t>(reader.number());
+  post.user = reader.number32();
   const uint64_t flags = reader.number();
   post.isByConsent = (flags & kByConsent) != 0;
   post.allowsCellularAccess = (flags & kCellular) != 0;
@@ -103,9 +117,9 @@ std::optional<StoredPost> readPostRecord(std::string_view record) {
   post.sourceApplication = reader.text();
   for (uint64_t left = reader.count(); left > 0; --left) {
     BookedEvents::OfRow& events = post.events.emplace_back();
-    events.events = reader.number();
-    events.row.program.user = static_cast<uint32_t>(reader.number());
-    events.row.program.clientType = static_cast<int32_t>(static_cast<uint32_t>(reader.number()));
+    events.events = reader.number32();
+    events.row.program.user = reader.number32();
+    events.row.program.clientType = static_cast<int32_t>(reader.number32());
     const uint64_t kind = reader.number();
     events.row.isInternal = (kind & kInternal) != 0;
     events.row.isOther = (kind & kOther) != 0;
@@ -117,16 +131,17 @@ std::optional<StoredPost> readPostRecord(std::string_view record) {
     std::string name = reader.text();
     post.headers.emplace_back(std::move(name), reader.text());
   }
-  if (!reader.isWhole()) return std::nullopt;
+  const bool isPossible = post.keptAt >= 0 && post.keptAt <= kLatest;
+  if (!reader.isWhole() || !isPossible) return std::nullopt;
   return post;
 }
 
 uint64_t postChecksum(std::string_view record, std::string_view body) {
-  constexpr uint64_t kPrime = 1099511628211U;
-  uint64_t sum = 14695981039346656037U;
-  for (const std::string_view part : {record, body})
-    for (const char c : part) sum = (sum ^ static_cast<unsigned char>(c)) * kPrime;
-  return sum;
+  return checksum({record, body});
+}
+
+uint64_t postHeadChecksum(int64_t number, std::string_view record) {
+  return checksum({std::to_string(number), record});
 }
 
 }  // namespace kyt

@@ -14,6 +14,8 @@ namespace kyt {
 [[nodiscard]] std::string postRecord(const StoredPost& post);
 // Number and body stay empty.
 [[nodiscard]] std::optional<StoredPost> readPostRecord(std::string_view record);
+// Of number and record, so that what is known of a post before its body is read is what was kept.
+[[nodiscard]] uint64_t postHeadChecksum(int64_t number, std::string_view record);
 // Of record and body, so that no byte of them is sent that was not kept (FNV-1a).
 [[nodiscard]] uint64_t postChecksum(std::string_view record, std::string_view body);
 

@@ -22,6 +22,7 @@
   ROW(columnInteger, sqlite3_column_int64)   \
   ROW(columnBlob, sqlite3_column_blob)       \
   ROW(columnBytes, sqlite3_column_bytes)     \
+  ROW(columnType, sqlite3_column_type)       \
   ROW(errorText, sqlite3_errmsg)             \
   ROW(textOfCode, sqlite3_errstr)            \
   ROW(isAutoCommit, sqlite3_get_autocommit)

@@ -2,10 +2,15 @@
 // each change on the disk before it returns (synchronous=FULL). The daemon has the file for itself, so SQLite needs no
 // file of shared memory. An empty outbox of more than a MiB has its file removed.
 //
-// The file names the version of its table. One of a later version is left alone: the store is unavailable then.
+// The file is made under another name and renamed when it is whole, so that an empty one has lost what was in it. It names
+// the version of its tables twice (user_version, application_id). One of a later version is left alone: the store is
+// unavailable then. What does not fit is damaged. Of a file whose disk fails at some pages the other rows are found, and a
+// row that cannot be deleted is noted as gone (table "gone"). Each row has a checksum of what is known of it before its
+// body is read, and one of all. A log of which frames are damaged that were whole once is seen as well.
 #pragma once
 
 #include <optional>
+#include <set>
 #include <span>
 #include <string>
 #include <string_view>
@@ -18,7 +23,7 @@ namespace kyt {
 
 class SQLitePostStore final : public PostStore {
  public:
-  static constexpr int kVersion = 1;
+  static constexpr int kVersion = 2;
   // The folder is there, and the daemon may write to it. `library`: for tests.
   explicit SQLitePostStore(std::string folder, const char* library = "libsqlite3.so.0");
   ~SQLitePostStore() override;
@@ -40,8 +45,20 @@ class SQLitePostStore final : public PostStore {
  private:
   using Problem = std::optional<PostStoreProblem>;
   [[nodiscard]] Problem begin();  // opens the file, and makes it
+  [[nodiscard]] Problem makeFile();
   [[nodiscard]] Problem openFile();
+  [[nodiscard]] Problem checkHeader(int descriptor) const;
   [[nodiscard]] Problem prepareFile();
+  [[nodiscard]] Problem checkVersion();
+  [[nodiscard]] Problem readGone();
+  // The first column of its first row; none: there is no row, or null in it.
+  [[nodiscard]] Problem query(const char* sql, std::optional<int64_t>& value, int column = 0,
+                              std::optional<int64_t> parameter = std::nullopt);
+  // From the post after that on; `after` goes along.
+  [[nodiscard]] Problem scan(int64_t& after, Function<void(StoredPostHead)>& found, bool& isOfOnePlace);
+  [[nodiscard]] StoredPostHead headOf(sqlite3_stmt* row);
+  // Past what the disk does not give, to the post before the next one that can be read.
+  [[nodiscard]] Problem skipUnreadable(int64_t& after, Function<void(StoredPostHead)>& found);
   [[nodiscard]] Problem execute(const char* sql);
   [[nodiscard]] Problem prepare(sqlite3_stmt*& statement, const char* sql);
   [[nodiscard]] Problem add(const StoredPost& post);
@@ -49,6 +66,10 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] Problem makeChange(std::span<const StoredPost* const> added,
                                    std::span<const int64_t> removed);
   [[nodiscard]] Problem run(sqlite3_stmt* statement);
+  // It failed at one page, others may be well.
+  [[nodiscard]] static bool isOfAPlace(int code);
+  [[nodiscard]] bool diskGivesFile() const;
+  [[nodiscard]] bool diskTakesAnother() const;
   [[nodiscard]] PostStoreProblem problem(int code, const char* what) const;
   [[nodiscard]] std::string_view blob(sqlite3_stmt* statement, int column) const;
 
@@ -56,7 +77,11 @@ class SQLitePostStore final : public PostStore {
   const char* const libraryName_;
   std::optional<SQLiteLibrary> sqlite_;
   sqlite3* database_ = nullptr;
-  sqlite3_stmt *insert_ = nullptr, *delete_ = nullptr, *select_ = nullptr;
+  sqlite3_stmt *insert_ = nullptr, *delete_ = nullptr, *select_ = nullptr, *mark_ = nullptr;
+  std::set<int64_t> gone_;        // rows that could not be deleted
+  std::optional<int64_t> stuck_;  // the one that the last change could not delete
+  bool isLogDamaged_ = false;
+  unsigned failedChanges_ = 0;  // in a row
 };
 
 }  // namespace kyt

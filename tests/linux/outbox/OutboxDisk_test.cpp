@@ -38,7 +38,29 @@ struct Fault {
   int times = 1;
   int error = EIO;
   bool waitsForNoDisk = false;
+  std::set<off_t>
+      bad{};  // places of the file itself, of kPlace bytes, that cannot be read until they are written
+  static constexpr off_t kPlace = 512;
   long seen = 0;
+  [[nodiscard]] bool isBad(int descriptor, size_t size, off_t at) const {
+    const auto first = bad.lower_bound(at / kPlace * kPlace);
+    if (first == bad.end() || *first >= at + static_cast<off_t>(size) || !isFile(descriptor)) return false;
+    errno = EIO;
+    return true;
+  }
+  void written(int descriptor, size_t size, off_t at) {
+    if (bad.empty() || !isFile(descriptor)) return;
+    for (off_t place = at; place < at + static_cast<off_t>(size); place += kPlace) bad.erase(place);
+  }
+  static bool isFile(int descriptor) {
+    std::error_code ignored;
+    return std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(descriptor), ignored)
+               .extension() == ".sqlite";
+  }
+  void makeBad(off_t from, off_t to) {
+    bad.clear();
+    for (off_t place = from; place < to; place += kPlace) bad.insert(place);
+  }
   bool fails(const char* name) {
     if (call != name) return false;
     const long number = seen++;
@@ -56,6 +78,11 @@ int fdatasync(int descriptor) {
   static auto* const real = reinterpret_cast<int (*)(int)>(::dlsym(RTLD_NEXT, "fdatasync"));
   if (fault.waitsForNoDisk) return 0;
   return fault.fails("fdatasync") ? -1 : real(descriptor);
+}
+ssize_t pread(int descriptor, void* bytes, size_t size, off_t at) {
+  static auto* const real =
+      reinterpret_cast<ssize_t (*)(int, void*, size_t, off_t)>(::dlsym(RTLD_NEXT, "pread"));
+  return fault.isBad(descriptor, size, at) ? -1 : real(descriptor, bytes, size, at);
 }
 int rename(const char* from, const char* to) {
   static auto* const real = reinterpret_cast<int (*)(const char*, const char*)>(::dlsym(RTLD_NEXT, "rename"));
@@ -82,11 +109,13 @@ int failingOpen(const char* path, int flags, int mode) {
 }
 ssize_t failingWrite(int descriptor, const void* bytes, size_t size, off_t at) {
   if (fault.fails("pwrite64")) return -1;
+  fault.written(descriptor, size, at);
   return reinterpret_cast<ssize_t (*)(int, const void*, size_t, off_t)>(real("pwrite64"))(descriptor, bytes,
                                                                                           size, at);
 }
 ssize_t failingRead(int descriptor, void* bytes, size_t size, off_t at) {
   if (fault.fails("pread64")) return -1;
+  if (fault.isBad(descriptor, size, at)) return -1;
   return reinterpret_cast<ssize_t (*)(int, void*, size_t, off_t)>(real("pread64"))(descriptor, bytes, size,
                                                                                    at);
 }
@@ -240,6 +269,96 @@ TEST_F(OutboxDiskTest, ClosesItsBooksWhicheverCallOfTheSystemFails) {
   }
   std::printf("%d runs, in %d of which the call failed\n", runs, failures);
   EXPECT_GT(failures, 100);
+}
+
+// Each place of the file in turn: what lies elsewhere is found, and more can be kept.
+TEST_F(OutboxDiskTest, FindsAllThatLiesElsewhereWhereADiskHasABadPlace) {
+  makeCallsFail();
+  constexpr int64_t kPosts = 40;
+  constexpr off_t kBlock = 4096;
+  const auto postOf = [](int64_t number) {
+    StoredPost post;
+    post.number = number;
+    post.url = "https://events.example.org";
+    post.body = Data(std::string(static_cast<size_t>(number) * 97 % 3000, 'x'));
+    return post;
+  };
+  {
+    SQLitePostStore store(folder_.path());
+    for (int64_t number = 1; number <= kPosts; ++number) {
+      const StoredPost post = postOf(number), *added = &post;
+      ASSERT_FALSE(store.change({&added, 1}, {}, false));
+    }
+  }
+  const std::string file = folder_.path() + "/outbox.sqlite", copy = folder_.path() + "/copy";
+  std::filesystem::copy_file(file, copy);
+  const auto size = static_cast<off_t>(std::filesystem::file_size(file));
+  int placesOfPosts = 0;
+  for (off_t at = kBlock; at < size; at += kBlock) {
+    std::filesystem::copy_file(copy, file, std::filesystem::copy_options::overwrite_existing);
+    fault.makeBad(at, at + kBlock);
+    std::set<int64_t> there, lost;
+    {
+      SQLitePostStore store(folder_.path());
+      const auto problem = store.open([&](const StoredPostHead& head) {
+        (head.isUnreadable || !std::holds_alternative<StoredPost>(store.read(head.post.number)) ? lost
+                                                                                                : there)
+            .insert(head.post.number);
+      });
+      if (problem) continue;  // the pages that lead to all others
+      EXPECT_GE(there.size(), kPosts - 9U) << at;
+      EXPECT_FALSE(lost.empty()) << at;
+      ++placesOfPosts;
+      const std::vector<int64_t> removed(lost.begin(), lost.end());
+      const StoredPost more = postOf(kPosts + 1), *added = &more;
+      const auto unable = store.change({&added, 1}, removed, false);
+      if (unable) continue;  // the place is where more would go
+    }
+    SQLitePostStore store(folder_.path());
+    std::set<int64_t> again;
+    EXPECT_FALSE(store.open([&](const StoredPostHead& head) {
+      if (!head.isUnreadable) again.insert(head.post.number);
+    }));
+    there.insert(kPosts + 1);
+    EXPECT_EQ(again, there) << at;
+  }
+  std::printf("%d places of %lld\n", placesOfPosts, static_cast<long long>(size / kBlock));
+  EXPECT_GE(placesOfPosts, static_cast<int>(size / kBlock) - 3);
+}
+
+TEST_F(OutboxDiskTest, LosesOnlyThePostThatLiesAtABadPlace) {
+  makeCallsFail();
+  answerEverything(false);
+  start();
+  for (int i = 0; i < 12; ++i) post(i);
+  stop();
+  books_ = std::make_unique<Books>();
+  fault.makeBad(off_t{5} * 4096, off_t{6} * 4096);
+  start();
+  post(12);
+  answerEverything(true);
+  for (int i = 0; i < 40; ++i) {
+    pass(std::chrono::minutes(10));
+    if (i < 8) {
+      answerEverything(false);
+      post(100 + i);  // the disk does other work
+      answerEverything(true);
+    }
+  }
+  const BookRow books = row();
+  EXPECT_EQ(books.outbox, 0U) << describeRow(books);
+  EXPECT_GE(books.delivered, 13U + 8U - 3U);
+  const uint64_t lost = test_.counters.value(Reason::outboxPostUnreadable);
+  EXPECT_GE(lost, 1U);
+  EXPECT_LE(lost, 3U);
+  EXPECT_EQ(books.taken, books.delivered + books.droppedFor(Reason::outboxUnreadable));
+  EXPECT_EQ(test_.counters.value(Reason::outboxFileDamaged), 0U);
+  EXPECT_EQ(test_.counters.value(Reason::postNotKept), 0U);
+  const auto before = taken_;
+  stop();
+  start();
+  pass(std::chrono::hours(1));
+  EXPECT_EQ(taken_, before) << "what could not be deleted does not come back";
 }
 
 TEST_F(OutboxDiskTest, BeginsAnewWhereADamagedFileCannotBeRenamed) {

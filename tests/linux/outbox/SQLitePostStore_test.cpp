@@ -7,6 +7,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "platform/linux/outbox/PostRecord.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -79,6 +80,27 @@ class SQLitePostStoreTest : public testing::Test {
     else
       EXPECT_FALSE(wrong) << wrong->text;
     return numbers;
+  }
+  void execute(const std::string& sql) const {
+    sqlite3* database = nullptr;
+    ASSERT_EQ(sqlite3_open(file().c_str(), &database), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(database, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
+        << sqlite3_errmsg(database);
+    sqlite3_close(database);
+  }
+  static std::string insertionOf(const StoredPost& post, uint64_t checksum) {
+    return "INSERT INTO posts VALUES (" + std::to_string(post.number) + ", " +
+           std::to_string(static_cast<int64_t>(checksum)) + ", x'" + hexadecimal(postRecord(post)) + "', x'" +
+           hexadecimal(post.body.view()) + "');";
+  }
+  static std::string hexadecimal(std::string_view bytes) {
+    std::string text;
+    for (const char c : bytes) {
+      char digits[3];
+      std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(c));
+      text += digits;
+    }
+    return text;
   }
   [[nodiscard]] std::string file() const { return folder_ / "outbox.sqlite"; }
   [[nodiscard]] std::string bytesOnDisk() const {
@@ -217,16 +239,123 @@ TEST_F(SQLitePostStoreTest, LeavesTheFileOfALaterVersionAlone) {
     SQLitePostStore store(folder_.path());
     ASSERT_FALSE(add(store, somePost(1)));
   }
-  sqlite3* database = nullptr;
-  ASSERT_EQ(sqlite3_open(file().c_str(), &database), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(database, "PRAGMA user_version=2", nullptr, nullptr, nullptr), SQLITE_OK);
-  sqlite3_close(database);
+  execute("PRAGMA user_version=3; PRAGMA application_id=1264145411");
   SQLitePostStore store(folder_.path());
   std::optional<PostStoreProblem> problem;
   EXPECT_TRUE(numbersIn(store, &problem).empty());
   ASSERT_TRUE(problem);
   EXPECT_EQ(problem->kind, Kind::unavailable);
   EXPECT_NE(problem->text.find("later version"), std::string::npos);
+}
+
+TEST_F(SQLitePostStoreTest, TakesUpAFileOfTheFirstVersion) {
+  const StoredPost first = somePost(1), second = somePost(2);
+  execute(
+      "PRAGMA page_size=512; PRAGMA journal_mode=WAL; CREATE TABLE posts (number INTEGER PRIMARY KEY, checksum"
+      " INTEGER NOT NULL, record BLOB NOT NULL, body BLOB NOT NULL); PRAGMA user_version=1;" +
+      insertionOf(first, postChecksum(postRecord(first), first.body.view())) + insertionOf(second, 77));
+  SQLitePostStore store(folder_.path());
+  std::vector<int64_t> good, bad;
+  EXPECT_FALSE(store.open(
+      [&](const StoredPostHead& head) { (head.isUnreadable ? bad : good).push_back(head.post.number); }));
+  EXPECT_EQ(good, std::vector<int64_t>({1}));
+  EXPECT_EQ(bad, std::vector<int64_t>({2})) << "nobody kept that";
+  auto read = store.read(1);
+  expectSame(std::get<StoredPost>(read), first);
+  EXPECT_FALSE(add(store, somePost(3)));
+  EXPECT_EQ(numbersIn(store), std::vector<int64_t>({1, 2, 3}));
+}
+
+TEST_F(SQLitePostStoreTest, TellsADamagedFileFromOneThatIsUnavailable) {
+  {
+    SQLitePostStore store(folder_.path());
+    ASSERT_FALSE(add(store, somePost(1)));
+  }
+  const std::string good = bytesOnDisk();
+  const auto problemOf = [&](const std::string& bytes, const std::string& sql) {
+    folder_.write("outbox.sqlite", bytes, 0600);
+    if (!sql.empty()) execute(sql);
+    SQLitePostStore store(folder_.path());
+    std::optional<PostStoreProblem> problem;
+    static_cast<void>(numbersIn(store, &problem));
+    return problem;
+  };
+  EXPECT_FALSE(problemOf(good, ""));
+  const auto with = [&good](size_t at, char value) {
+    std::string bytes = good;
+    bytes[at] = value;
+    return bytes;
+  };
+  const std::pair<std::string, std::string> cases[] = {{"", ""},
+                                                       {good.substr(0, 60), ""},
+                                                       {with(0, 's'), ""},
+                                                       {with(16, 4), ""},   // the size of its pages
+                                                       {with(18, 9), ""},   // who may write it
+                                                       {with(19, 9), ""},   // who may read it
+                                                       {with(63, 66), ""},  // its version
+                                                       {with(71, 3), ""},   // … where it stands again
+                                                       {good, "PRAGMA user_version=0"},
+                                                       {good, "DROP TABLE posts"},
+                                                       {good, "DROP TABLE gone"}};
+  for (const auto& [bytes, sql] : cases) {
+    const auto problem = problemOf(bytes, sql);
+    ASSERT_TRUE(problem) << &bytes - &cases[0].first << " " << sql;
+    EXPECT_EQ(problem->kind, Kind::damaged) << problem->text;
+  }
+}
+
+TEST_F(SQLitePostStoreTest, BelievesNothingOfARowThatIsNotWhatWasKept) {
+  {
+    SQLitePostStore store(folder_.path());
+    for (int64_t number = 1; number <= 4; ++number) ASSERT_FALSE(add(store, somePost(number)));
+  }
+  StoredPost other = somePost(2);
+  other.isByConsent = false;
+  execute("UPDATE posts SET record=x'" + hexadecimal(postRecord(other)) + "' WHERE number=2;" +
+          "UPDATE posts SET number=9223372036854775807 WHERE number=3");
+  SQLitePostStore store(folder_.path());
+  std::vector<int64_t> good, bad;
+  EXPECT_FALSE(store.open(
+      [&](const StoredPostHead& head) { (head.isUnreadable ? bad : good).push_back(head.post.number); }));
+  EXPECT_EQ(good, std::vector<int64_t>({1, 4}));
+  EXPECT_EQ(bad, std::vector<int64_t>({2, INT64_MAX}));
+}
+
+// As after a process that was killed: the log holds what is not in the file yet.
+TEST_F(SQLitePostStoreTest, SeesThatItsLogWasWholeOnce) {
+  const TemporaryFolder live;
+  SQLitePostStore writer(live.path());
+  for (int64_t number = 1; number <= 5; ++number) ASSERT_FALSE(add(writer, somePost(number)));
+  const auto bytesOf = [&live](const char* name) {
+    std::ostringstream text;
+    text << std::ifstream(live / name, std::ios::binary).rdbuf();
+    return text.str();
+  };
+  const std::string database = bytesOf("outbox.sqlite"), log = bytesOf("outbox.sqlite-wal");
+  constexpr size_t kFrame = 512 + 24;
+  ASSERT_GE(log.size(), 20 * kFrame);
+  // How many are found, and whether it is said that some are lost.
+  const auto found = [&](const std::string& bytes) {
+    folder_.write("outbox.sqlite", database, 0600);
+    folder_.write("outbox.sqlite-wal", bytes, 0600);
+    SQLitePostStore store(folder_.path());
+    std::pair<size_t, bool> result;
+    const auto problem = store.open([&](const StoredPostHead& head) {
+      result.first += head.isUnreadable ? 0 : 1;
+      result.second = result.second || head.isUnreadable;
+    });
+    EXPECT_FALSE(problem) << problem->text;
+    return result;
+  };
+  EXPECT_EQ(found(log), (std::pair<size_t, bool>(5, false)));
+  std::string bad = log;
+  bad[32 + 9 * kFrame + 100] = static_cast<char>(bad[32 + 9 * kFrame + 100] ^ 1);
+  const auto damaged = found(bad);
+  EXPECT_LT(damaged.first, 5U);
+  EXPECT_TRUE(damaged.second);
+  const auto cut = found(log.substr(0, log.size() - kFrame - 10));
+  EXPECT_EQ(cut.first, 4U);
+  EXPECT_FALSE(cut.second) << "the last change was never finished";
 }
 
 TEST_F(SQLitePostStoreTest, LeavesNothingOnTheDiskOfWhatWasRemovedForGood) {

@@ -1,0 +1,283 @@
+// How the outbox's file is made, checked and read at the start.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <utility>
+
+#include "platform/linux/base/Descriptors.h"
+#include "platform/linux/files/Files.h"
+#include "platform/linux/outbox/PostRecord.h"
+#include "platform/linux/outbox/SQLitePostStore.h"
+#include "platform/linux/outbox/WriteAheadLog.h"
+
+namespace kyt {
+namespace {
+
+using Kind = PostStoreProblem::Kind;
+
+constexpr mode_t kMode = 0600;
+constexpr int64_t kApplication = 0x4B595400;  // "KYT" and the version
+constexpr int64_t kVersionBits = 0xFF;
+constexpr int64_t kGreatestNumber = int64_t{1} << 53;
+// Places at which the disk does not give what lies there; more, and it gives nothing.
+constexpr unsigned kMostSkips = 64;
+constexpr size_t kHeaderBytes = 100;
+
+// Small pages, since each that holds a byte of a post is written twice, to the log and to the file.
+constexpr char kBeginning[] =
+    "PRAGMA page_size=512; PRAGMA locking_mode=EXCLUSIVE; PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
+    "PRAGMA temp_store=MEMORY; PRAGMA cache_size=-256; PRAGMA wal_autocheckpoint=2048;"
+    "PRAGMA journal_size_limit=2097152; PRAGMA secure_delete=FAST; PRAGMA trusted_schema=OFF;";
+constexpr char kTables[] =
+    "BEGIN IMMEDIATE; CREATE TABLE posts (number INTEGER PRIMARY KEY, checksum INTEGER NOT NULL,"
+    " record BLOB NOT NULL, body BLOB NOT NULL, head INTEGER);"
+    "CREATE TABLE gone (number INTEGER PRIMARY KEY);"
+    "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
+// Rows of the first version have no checksum of their head: the other one is looked at.
+constexpr char kFromTheFirst[] =
+    "BEGIN IMMEDIATE; ALTER TABLE posts ADD COLUMN head INTEGER;"
+    "CREATE TABLE gone (number INTEGER PRIMARY KEY);"
+    "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
+static_assert((kApplication | SQLitePostStore::kVersion) == 1264145410);
+
+}  // namespace
+
+SQLitePostStore::Problem SQLitePostStore::begin() {
+  if (database_ != nullptr) return std::nullopt;
+  if (!sqlite_) {
+    auto loaded = SQLiteLibrary::load(libraryName_);
+    if (auto* text = std::get_if<std::string>(&loaded))
+      return PostStoreProblem{Kind::unavailable, std::move(*text)};
+    sqlite_ = std::get<SQLiteLibrary>(loaded);
+  }
+  Problem wrong;
+  if (::access(file_.c_str(), F_OK) != 0 && errno == ENOENT) wrong = makeFile();
+  if (!wrong) wrong = openFile();
+  if (!wrong) wrong = prepareFile();
+  if (wrong) close();
+  return wrong;
+}
+
+// Under its name there is a whole one or none.
+SQLitePostStore::Problem SQLitePostStore::makeFile() {
+  const std::string made = file_ + ".new";
+  const auto unlinkAll = [&made] {
+    for (const char* end : {"", "-wal", "-journal"}) static_cast<void>(::unlink((made + end).c_str()));
+  };
+  struct stat link {};
+  if (::lstat(file_.c_str(), &link) == 0)
+    return PostStoreProblem{Kind::unavailable, file_ + ": is no regular file"};
+  unlinkAll();
+  // Made here for its mode, which SQLite gives its log too.
+  if (ownDescriptor(::open(made.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, kMode)).get() <
+      0)
+    return PostStoreProblem{Kind::unavailable, made + ": " + errorText(errno)};
+  const int code =
+      sqlite_->open(made.c_str(), &database_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+  Problem wrong;
+  if (code != SQLITE_OK) wrong = problem(code, made.c_str());
+  if (!wrong) wrong = execute(kBeginning);
+  if (!wrong) wrong = execute(kTables);
+  close();
+  if (!wrong && std::rename(made.c_str(), file_.c_str()) != 0)
+    wrong = PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  if (wrong) {
+    wrong->kind = Kind::unavailable;
+    unlinkAll();
+    return wrong;
+  }
+  const Descriptor folder =
+      ownDescriptor(::open(file_.substr(0, file_.rfind('/')).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (folder.get() < 0 || ::fsync(folder.get()) != 0)
+    return PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  return std::nullopt;
+}
+
+SQLitePostStore::Problem SQLitePostStore::openFile() {
+  const Descriptor opened = ownDescriptor(::open(file_.c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
+  if (opened.get() < 0) return PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  struct stat status {};
+  const bool isOurs = ::fstat(opened.get(), &status) == 0 && S_ISREG(status.st_mode);
+  if (!isOurs) return PostStoreProblem{Kind::unavailable, file_ + ": is no regular file"};
+  if ((status.st_mode & 07777) != kMode && ::fchmod(opened.get(), kMode) != 0)
+    return PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  if (Problem wrong = checkHeader(opened.get())) return wrong;
+  const int code =
+      sqlite_->open(file_.c_str(), &database_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+  if (code == SQLITE_OK) return std::nullopt;
+  return problem(code, file_.c_str());
+}
+
+// What of it no change of the file ever changes, and of which SQLite would say no more than that the file cannot be written,
+// or take it for a new one.
+SQLitePostStore::Problem SQLitePostStore::checkHeader(int descriptor) const {
+  std::array<char, kHeaderBytes> bytes{};
+  const ssize_t size = ::pread(descriptor, bytes.data(), bytes.size(), 0);
+  if (size < 0) return PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  const std::string_view header(bytes.data(), static_cast<size_t>(size));
+  const auto isVersion = [](char value) { return value == 1 || value == 2; };
+  constexpr std::string_view kBegin("SQLite format 3\0\x02\x00", 18);
+  if (header.size() == kHeaderBytes && header.substr(0, kBegin.size()) == kBegin && isVersion(header[18]) &&
+      isVersion(header[19]))
+    return std::nullopt;
+  return PostStoreProblem{Kind::damaged, file_ + (size == 0 ? ": is empty" : ": its beginning is damaged")};
+}
+
+SQLitePostStore::Problem SQLitePostStore::query(const char* sql, std::optional<int64_t>& value, int column,
+                                                std::optional<int64_t> parameter) {
+  sqlite3_stmt* statement = nullptr;
+  Problem wrong = prepare(statement, sql);
+  if (wrong) return wrong;
+  if (parameter) sqlite_->bindInteger(statement, 1, *parameter);
+  value.reset();
+  const int code = sqlite_->step(statement);
+  if (code == SQLITE_ROW && sqlite_->columnType(statement, column) != SQLITE_NULL)
+    value = sqlite_->columnInteger(statement, column);
+  else if (code != SQLITE_ROW && code != SQLITE_DONE)
+    wrong = problem(code, file_.c_str());
+  sqlite_->finalize(statement);
+  return wrong;
+}
+
+SQLitePostStore::Problem SQLitePostStore::prepareFile() {
+  const uint64_t wholeFrames = lastWholeFrame(file_ + "-wal");
+  if (Problem wrong = execute(kBeginning)) return wrong;
+  std::optional<int64_t> frames;
+  if (wholeFrames != 0)
+    if (Problem wrong = query("PRAGMA wal_checkpoint(PASSIVE)", frames, 1)) return wrong;
+  isLogDamaged_ = isLogDamaged_ || (frames && *frames >= 0 && static_cast<uint64_t>(*frames) < wholeFrames);
+  if (Problem wrong = checkVersion()) return wrong;
+  if (Problem wrong = prepare(insert_, "INSERT INTO posts VALUES (?, ?, ?, ?, ?)")) return wrong;
+  if (Problem wrong = prepare(delete_, "DELETE FROM posts WHERE number = ?")) return wrong;
+  if (Problem wrong = prepare(mark_, "INSERT OR IGNORE INTO gone VALUES (?)")) return wrong;
+  if (Problem wrong = prepare(select_, "SELECT checksum, record, body FROM posts WHERE number = ?"))
+    return wrong;
+  return readGone();
+}
+
+// It stands in the file twice, so that one that is damaged is not taken for a later one.
+SQLitePostStore::Problem SQLitePostStore::checkVersion() {
+  std::optional<int64_t> version, application;
+  if (Problem wrong = query("PRAGMA user_version", version)) return wrong;
+  if (Problem wrong = query("PRAGMA application_id", application)) return wrong;
+  if (version == 1 && application == 0) return execute(kFromTheFirst);
+  const bool isWhole = version && application && (*application & ~kVersionBits) == kApplication &&
+                       (*application & kVersionBits) == *version && *version >= kVersion;
+  if (!isWhole) return PostStoreProblem{Kind::damaged, file_ + ": its version is damaged"};
+  if (*version == kVersion) return std::nullopt;
+  return PostStoreProblem{Kind::unavailable, file_ + ": was written by a later version of the daemon"};
+}
+
+SQLitePostStore::Problem SQLitePostStore::readGone() {
+  sqlite3_stmt* all = nullptr;
+  if (Problem wrong = prepare(all, "SELECT number FROM gone")) return wrong;
+  int code = SQLITE_ROW;
+  while ((code = sqlite_->step(all)) == SQLITE_ROW) gone_.insert(sqlite_->columnInteger(all, 0));
+  Problem wrong;
+  if (code != SQLITE_DONE) wrong = problem(code, file_.c_str());
+  sqlite_->finalize(all);
+  return wrong;
+}
+
+// Columns: number, record, size of the body, checksum of the head (null: of a file of the first version).
+StoredPostHead SQLitePostStore::headOf(sqlite3_stmt* row) {
+  const int64_t number = sqlite_->columnInteger(row, 0);
+  const std::string_view record = blob(row, 1);
+  StoredPostHead head;
+  head.post.number = number;
+  head.isUnreadable = true;
+  auto post = number >= 1 && number <= kGreatestNumber ? readPostRecord(record) : std::nullopt;
+  if (!post) return head;
+  if (sqlite_->columnType(row, 3) == SQLITE_NULL) {
+    if (!std::holds_alternative<StoredPost>(read(number))) return head;
+  } else if (static_cast<uint64_t>(sqlite_->columnInteger(row, 3)) != postHeadChecksum(number, record)) {
+    return head;
+  }
+  post->number = number;
+  head.bytes = PostStore::bytesOf(*post) + static_cast<uint64_t>(sqlite_->columnInteger(row, 2));
+  head.isUnreadable = false;
+  head.post = std::move(*post);
+  head.post.headers.clear();
+  return head;
+}
+
+SQLitePostStore::Problem SQLitePostStore::scan(int64_t& after, Function<void(StoredPostHead)>& found,
+                                               bool& isOfOnePlace) {
+  isOfOnePlace = false;
+  sqlite3_stmt* rows = nullptr;
+  if (Problem wrong = prepare(
+          rows, "SELECT number, record, length(body), head FROM posts WHERE number >= ? ORDER BY number"))
+    return wrong;
+  // Not "number > after", which would look for it where that one lies.
+  sqlite_->bindInteger(rows, 1, after == INT64_MAX ? after : after + 1);
+  int code = SQLITE_ROW;
+  while ((code = sqlite_->step(rows)) == SQLITE_ROW) {
+    StoredPostHead head = headOf(rows);
+    after = head.post.number;
+    if (!gone_.contains(after)) found(std::move(head));
+  }
+  Problem wrong;
+  if (code != SQLITE_DONE) wrong = problem(code, file_.c_str());
+  isOfOnePlace = isOfAPlace(code);
+  sqlite_->finalize(rows);
+  return wrong;
+}
+
+// Rows lie in the order of their numbers, so between the last one that was read and the next one that can be found lies what
+// cannot. That one is looked for at distances that double, and then halve.
+SQLitePostStore::Problem SQLitePostStore::skipUnreadable(int64_t& after,
+                                                         Function<void(StoredPostHead)>& found) {
+  constexpr char kNext[] = "SELECT number FROM posts WHERE number >= ? ORDER BY number LIMIT 1";
+  std::optional<int64_t> greatest, next;
+  if (Problem wrong = query("SELECT max(number) FROM posts", greatest)) return wrong;
+  if (!query(kNext, next, 0, after + 1)) {  // the row is there, what is in it is not
+    if (!next) return std::nullopt;
+    after = *next;
+  } else {
+    int64_t bad = after + 1, good = after + 2;
+    for (int64_t step = 1; good <= greatest.value_or(0) && query(kNext, next, 0, good); step *= 2) {
+      bad = good;
+      good += step * 2;
+    }
+    good = std::min(good, std::max(greatest.value_or(0), bad + 1));
+    while (good - bad > 1) {
+      const int64_t middle = bad + (good - bad) / 2;
+      (query(kNext, next, 0, middle) ? bad : good) = middle;
+    }
+    after = bad;
+  }
+  StoredPostHead lost;
+  lost.post.number = after;
+  lost.isUnreadable = true;
+  if (!gone_.contains(after)) found(std::move(lost));
+  return std::nullopt;
+}
+
+std::optional<PostStoreProblem> SQLitePostStore::open(Function<void(StoredPostHead)> found) {
+  if (::access(file_.c_str(), F_OK) != 0) {
+    if (errno == ENOENT) return std::nullopt;
+    return PostStoreProblem{Kind::unavailable, file_ + ": " + errorText(errno)};
+  }
+  if (Problem wrong = begin()) return wrong;
+  int64_t after = INT64_MIN;  // no post has that number
+  unsigned skips = 0;
+  bool isOfOnePlace = false;
+  while (Problem wrong = scan(after, found, isOfOnePlace)) {
+    if (!isOfOnePlace || ++skips > kMostSkips) return wrong;
+    after = std::max<int64_t>(after, 0);
+    if (skipUnreadable(after, found)) return wrong;
+  }
+  if (std::exchange(isLogDamaged_, false)) {
+    StoredPostHead lost;
+    lost.isUnreadable = true;
+    found(std::move(lost));
+  }
+  return std::nullopt;
+}
+
+}  // namespace kyt
