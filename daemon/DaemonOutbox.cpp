@@ -30,7 +30,9 @@ DaemonOutbox::DaemonOutbox(Ports ports)
           Outbox::create({ports.clock, ports.timers, ports.random, workers_, ports.consent, ports.counters,
                           ports.log, ports.books, ports.departures, ports.network, store_},
                          ports.settings)),
-      sessions_(ports.network, outbox_, workers_) {}
+      sessions_(ports.network, outbox_, workers_),
+      consentWatch_(ports.reactor, ports.consentFolder, ports.consentFile,
+                    [this] { outbox_->consentMayHaveChanged(); }) {}
 
 DaemonOutbox::~DaemonOutbox() = default;
 

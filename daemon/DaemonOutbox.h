@@ -8,6 +8,7 @@
 
 #include "outbox/Outbox.h"
 #include "outbox/OutboxURLSession.h"
+#include "platform/linux/base/FileWatch.h"
 #include "platform/linux/outbox/SQLitePostStore.h"
 #include "platform/queues/WorkerPool.h"
 
@@ -27,6 +28,8 @@ class DaemonOutbox {
     Books& books;
     Departures& departures;
     URLSessionFactory& network;
+    Reactor& reactor;
+    std::string consentFolder, consentFile;  // where the owner's decision stands
   };
   explicit DaemonOutbox(Ports ports);
   ~DaemonOutbox();
@@ -47,6 +50,7 @@ class DaemonOutbox {
   SQLitePostStore store_;
   const std::shared_ptr<Outbox> outbox_;
   OutboxURLSessionFactory sessions_;
+  const FileWatch consentWatch_;
 };
 
 }  // namespace kyt

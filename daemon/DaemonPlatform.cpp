@@ -30,6 +30,8 @@ CurlURLSessionOptions urlSessionOptions(const Settings& settings, ServerRecords&
   return options;
 }
 
+constexpr char kConsentFile[] = "com.vantu.diagnostics.toml";  // of kDiagnosticsDefaultsDomain
+
 TomlUserDefaultsOptions userDefaultsOptions(const Paths& paths, const UserBudget& budget) {
   TomlUserDefaultsOptions options;
   options.folder = paths.userDefaults();
@@ -62,7 +64,7 @@ DaemonPlatform::DaemonPlatform(Start start)
       deflate(std::move(start.deflate)),
       userDefaults(userDefaultsOptions(start.paths, budget), start.log, start.counters, clock),
       deviceProperties(deviceSources(start.paths), cryptography, start.log, clock),
-      consent(userDefaults),
+      consent(userDefaults, start.paths.userDefaults() + "/" + kConsentFile),
       clientBundle(start.paths.clientBundle(), start.log),
       daemonBundle(start.paths.daemonBundle(), start.log),
       entitlements(entitlementsOptions(start.paths), start.inspector, start.log, start.counters, clock),
@@ -70,9 +72,10 @@ DaemonPlatform::DaemonPlatform(Start start)
                  SerialQueue::create("kyt.departures", workers)),
       network(urlSessionOptions(start.settings, servers), start.log, start.counters),
       outbox(start.settings.outbox.enabled
-                 ? std::make_unique<DaemonOutbox>(DaemonOutbox::Ports{
-                       start.settings.outbox, start.paths.outbox(), clock, *reactor, random, consent,
-                       start.counters, start.log, books, departures, network})
+                 ? std::make_unique<DaemonOutbox>(
+                       DaemonOutbox::Ports{start.settings.outbox, start.paths.outbox(), clock, *reactor,
+                                           random, consent, start.counters, start.log, books, departures,
+                                           network, *reactor, start.paths.userDefaults(), kConsentFile})
                  : nullptr),
       urlSessions(outbox ? outbox->sessions() : network),
       fileExtensions(start.broker, start.log, start.counters, budget),

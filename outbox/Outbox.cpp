@@ -14,7 +14,6 @@ namespace {
 
 // The pool gives one thread to each owner, so this queue runs beside one that waits for the disk. No user has this number.
 constexpr uint64_t kDeadlinesOwner = ~uint64_t{0};
-constexpr int64_t kClockWasSet = 1577836800;  // a clock before 2020 has not been set
 
 }  // namespace
 
@@ -160,18 +159,6 @@ void Outbox::flush() {
   wake();
 }
 
-int64_t Outbox::seconds() const {
-  return std::chrono::duration_cast<std::chrono::seconds>(ports_.clock.monotonic().time_since_epoch())
-      .count();
-}
-
-// A clock that jumps makes no post old.
-int64_t Outbox::bornAt(int64_t keptAt) const {
-  const int64_t now = ports_.clock.timeOfDay().seconds;
-  if (keptAt == 0 || now < kClockWasSet || keptAt > now) return seconds();
-  return seconds() - (now - keptAt);
-}
-
 void Outbox::turn() {
   Inbox inbox;
   {
@@ -183,6 +170,7 @@ void Outbox::turn() {
   for (Answer& answer : inbox.answers) take(answer);
   if (isLoaded_) {
     forgetWithoutConsent();
+    takeTime();
     forgetTooOld();
     // By itself, so that a log that cannot be cut short says nothing of what is new.
     if (removesForGood_) commit(Plan());
@@ -192,7 +180,10 @@ void Outbox::turn() {
   takeNews(inbox);
   if (posts_.size() == 0 && isLoaded_) {
     books_.dropRest(Reason::outboxUnreadable);  // of posts that were not what had been kept
-    if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) ports_.store.becameEmpty();
+    if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) {
+      ports_.store.becameEmpty();
+      isConsentNoted_ = false;
+    }
   }
   posts_.forgetGone();
   if (posts_.size() == 0) books_.forgetContents();
@@ -225,27 +216,6 @@ void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
   books_.drop(entry.number, events, fate);
   removed_.push_back(entry.number);
   posts_.remove(entry);
-}
-
-void Outbox::forgetWithoutConsent() {
-  const bool wasGiven = std::exchange(wasConsentGiven_, ports_.consent.isSubmissionAllowed());
-  if (wasConsentGiven_) return;
-  if (wasGiven) ports_.store.removeSetAside();  // nobody knows what is in it
-  if (posts_.byConsent() == 0) return;
-  ports_.log.normal("Outbox: The consent is withdrawn, %zu posts that were collected by it are deleted",
-                    posts_.byConsent());
-  for (KeptPosts::Entry& entry : posts_.entries())
-    if (!entry.isGone && entry.isByConsent) leave(entry, Reason::outboxConsentWithdrawn);
-  removesForGood_ = true;
-}
-
-void Outbox::forgetTooOld() {
-  const int64_t oldest = seconds() - static_cast<int64_t>(settings_.maxAgeSeconds);
-  for (KeptPosts::Entry& entry : posts_.entries()) {
-    if (entry.isGone) continue;
-    if (entry.born >= oldest) break;
-    leave(entry, Reason::outboxTooOld);
-  }
 }
 
 uint64_t Outbox::drop(Filter filter) {
@@ -282,14 +252,14 @@ bool Outbox::makeRoom(Plan& plan, uint32_t user, uint64_t bytes) {
 
 void Outbox::keepAll(std::vector<Incoming> posts) {
   Plan plan;
-  const int64_t now = ports_.clock.timeOfDay().seconds;
   for (Incoming& incoming : posts) {
     if (!isWaiting(incoming.ticket)) continue;
     StoredPost& post = incoming.failed.post;
     const uint64_t bytes = PostStore::bytesOf(post);
     const bool fits =
         bytes <= settings_.maxBytes && bytes <= settings_.maxBytesPerUser && bytes <= UINT32_MAX;
-    if (!isLoaded_ || !fits || diskRests() || (post.isByConsent && !wasConsentGiven_)) {
+    const bool isAllowed = !post.isByConsent || (wasConsentGiven_ && noteConsent());
+    if (!isLoaded_ || !fits || !isAllowed || diskRests()) {
       refuse(incoming);
       continue;
     }
@@ -302,10 +272,11 @@ void Outbox::keepAll(std::vector<Incoming> posts) {
       }
     }
     post.number = last_ + 1 + static_cast<int64_t>(plan.posts.size());
-    post.keptAt = now >= kClockWasSet ? now : 0;
+    post.keptAt = timeNow().value_or(0);
     post.events = incoming.failed.booked ? incoming.failed.booked->rows() : OutboxBooks::Events();
     posts_.add(post.number, serverOfLine(post.url), bytes, post.user, post.isByConsent, seconds()).contents =
         books_.remember(post.events);
+    oldestBorn_ = std::min(oldestBorn_, seconds());
     plan.posts.push_back(std::move(incoming));
   }
   commit(std::move(plan));
@@ -320,6 +291,7 @@ void Outbox::kept(Plan& plan) {
   for (Incoming& incoming : plan.posts) {
     last_ = incoming.failed.post.number;
     const StoredPost& post = incoming.failed.post;
+    if (post.keptAt == 0) untimed_ = last_;
     auto waiting = takeWaiting(incoming.ticket);
     if (!waiting) {  // told already that it is not kept
       removed_.push_back(last_);

@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <limits>
 #include <map>
 #include <memory>
 #include <optional>
@@ -90,6 +91,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
 
   // Reads what an earlier process left, and sends it.
   void begin();
+  // The owner may have decided anew.
+  void consentMayHaveChanged() { wake(); }
   // Keeps the post, or not: `settled` is told once, when it is on disk (the post counts as outbox in the books then) or
   // when it cannot be: on the caller's thread before this returns, on the outbox's queue, or on another one when the disk has
   // taken longer than Limits::outboxCommitTime.
@@ -166,7 +169,14 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void load() REQUIRES(*queue_);
   void forgetUnreadable(const std::vector<int64_t>& numbers) REQUIRES(*queue_);
   [[nodiscard]] int64_t bornAt(int64_t keptAt) const;
-  [[nodiscard]] int64_t seconds() const;
+  [[nodiscard]] int64_t seconds() const;                 // since the boot
+  [[nodiscard]] std::optional<int64_t> timeNow() const;  // since 1970; none: the clock has not been set
+  void noteAge(const StoredPost& post) REQUIRES(*queue_);
+  void takeTime() REQUIRES(*queue_);
+  void takeAges() REQUIRES(*queue_);
+  void doubtNoAges() REQUIRES(*queue_);
+  [[nodiscard]] bool believesAges() REQUIRES(*queue_);
+  [[nodiscard]] bool noteConsent() REQUIRES(*queue_);
 
   void take(Answer& answer) REQUIRES(*queue_);
   void tellOwner(const std::string& url, const OutboxBooks::Events& events, uint64_t bodyBytes,
@@ -241,12 +251,22 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   size_t bytesInFlight_ GUARDED_BY(*queue_) = 0;
   std::vector<int64_t> removed_ GUARDED_BY(*queue_);  // not yet from the file
   bool removesForGood_ GUARDED_BY(*queue_) = false;
-  int64_t last_ GUARDED_BY(*queue_) = 0;
+  int64_t last_ GUARDED_BY(*queue_) = 0, lastLoaded_ GUARDED_BY(*queue_) = 0;
   uint64_t diskWork_ GUARDED_BY(*queue_) = 0;      // what the disk has done well
   unsigned unreadInARow_ GUARDED_BY(*queue_) = 0;  // posts that it did not give
   MonotonicTime readingRestsUntil_ GUARDED_BY(*queue_){};
   bool isLoaded_ GUARDED_BY(*queue_) = false, isWatching_ GUARDED_BY(*queue_) = false;
   bool isClosed_ GUARDED_BY(*queue_) = false, wasConsentGiven_ GUARDED_BY(*queue_) = true;
+  uint64_t consentEpoch_ GUARDED_BY(*queue_) = 0;  // of the last look
+  bool isConsentNoted_ GUARDED_BY(*queue_) = false, mustRemoveSetAside_ GUARDED_BY(*queue_) = false;
+  // Ages, in seconds since the boot.
+  int64_t oldestBorn_ GUARDED_BY(*queue_) = std::numeric_limits<int64_t>::max();  // none is older
+  int64_t loadedAt_ GUARDED_BY(*queue_) = 0, nextAgeLook_ GUARDED_BY(*queue_) = 0;
+  int64_t nextSetAsideLook_ GUARDED_BY(*queue_) = 0;
+  int64_t untimed_ GUARDED_BY(*queue_) =
+      0;  // the last post of which the clock has not said when it was kept; 0: none
+  bool hasAgesToTake_ GUARDED_BY(*queue_) =
+      false;  // posts of before the start, when the clock had not been set
   TimerHandle timer_ GUARDED_BY(*queue_);
 };
 

@@ -31,19 +31,24 @@ void Outbox::load() {
              bornAt(post.keptAt))
         .contents = books_.remember(post.events);
     last_ = post.number;
+    noteAge(post);
   });
   if (problem && problem->kind == PostStoreProblem::Kind::unavailable) {
     // Once more, from the beginning.
     posts_.clear();
+    oldestBorn_ = std::numeric_limits<int64_t>::max();
     books_.forgetContents();
     return handle(*problem);
   }
   isLoaded_ = true;
+  loadedAt_ = seconds();
   OutboxBooks::Events all;
   for (const auto& [row, count] : found) all.push_back({row, count});
   books_.restore(all);
   if (problem) return handle(*problem);
   forgetUnreadable(unreadable);
+  lastLoaded_ = last_;
+  if (oldestBorn_ >= loadedAt_ - static_cast<int64_t>(settings_.maxAgeSeconds)) doubtNoAges();
   if (posts_.size() == 0) return;
   ports_.log.normal("Outbox: %zu posts of %llu bytes are left from before", posts_.size(),
                     static_cast<unsigned long long>(posts_.bytes()));
@@ -73,7 +78,7 @@ OutboxBooks::Events Outbox::eventsOf(const KeptPosts::Entry& entry) {
 }
 
 void Outbox::commit(Plan plan) {
-  if (plan.posts.empty() && plan.displaced.empty() && removed_.empty()) return;
+  if (plan.posts.empty() && plan.displaced.empty() && removed_.empty() && !removesForGood_) return;
   if (diskRests()) return notKept(plan);
   std::vector<const StoredPost*> added;
   added.reserve(plan.posts.size());
@@ -87,6 +92,7 @@ void Outbox::commit(Plan plan) {
   }
   ++diskWork_;
   removed_.clear();
+  if (removesForGood_ && posts_.byConsent() == 0) isConsentNoted_ = false;  // the file may be gone
   removesForGood_ = false;
   kept(plan);
 }
@@ -132,7 +138,9 @@ void Outbox::handle(const PostStoreProblem& problem) {
     removed_.clear();
     removesForGood_ = false;
     books_.dropRest(Reason::outboxUnreadable);
-    if (!wasConsentGiven_) ports_.store.removeSetAside();
+    if (!wasConsentGiven_)
+      mustRemoveSetAside_ = !ports_.store.removeSetAside(std::numeric_limits<int64_t>::max());
+    isConsentNoted_ = false;
     return;
   }
   {

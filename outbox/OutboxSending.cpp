@@ -249,10 +249,11 @@ bool Outbox::send(KeptPosts::Entry& entry) {
 
 void Outbox::setTimer() {
   timer_.cancel();
-  if (posts_.size() == 0 && removed_.empty() && isLoaded_) return;
+  const bool mustRemove = !removed_.empty() || removesForGood_ || mustRemoveSetAside_;
+  if (posts_.size() == 0 && !mustRemove && isLoaded_) return;
   const MonotonicTime now = ports_.clock.monotonic();
   MonotonicTime next = now + kLongestRest;
-  if (diskRests() || !isLoaded_ || !removed_.empty()) {
+  if (diskRests() || !isLoaded_ || mustRemove) {
     next = now + kDiskPause;
   } else if (!isStopping_) {
     for (const auto& [server, line] : posts_.lines())

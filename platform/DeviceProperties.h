@@ -26,6 +26,9 @@ class DiagnosticsConsent {
  public:
   virtual ~DiagnosticsConsent() = default;
   [[nodiscard]] virtual bool isSubmissionAllowed() = 0;
+  // Another number after each time that it was withdrawn, perhaps also at other times; never 0. What was collected by it
+  // under another number may have been collected by one that was withdrawn and given again.
+  [[nodiscard]] virtual uint64_t epoch() { return 1; }
 };
 
 }  // namespace kyt

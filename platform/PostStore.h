@@ -23,7 +23,7 @@ inline constexpr uint32_t kNoUser = ~uint32_t{0};  // the daemon's own post
 
 struct StoredPost {
   int64_t number = 0;        // from 1, in the order in which they were kept
-  int64_t keptAt = 0;        // seconds since 1970; 0: the clock had not been set
+  int64_t keptAt = 0;        // seconds since 1970; 0: the clock had not been set; see PostStore::setLatest
   uint32_t user = kNoUser;   // whose share it counts towards
   bool isByConsent = false;  // see URLRequest
   bool allowsCellularAccess = true;
@@ -62,17 +62,27 @@ class PostStore {
   // written to is not made by this.
   [[nodiscard]] virtual std::optional<PostStoreProblem> open(Function<void(StoredPostHead)> found) = 0;
   // Adds and removes; numbers that are not there are removed already, and those that the disk does not give are from now on not
-  // there. `forGood`: what is removed is overwritten too.
+  // there. `forGood`: what is removed, and
+  // what was removed before, is overwritten too.
   [[nodiscard]] virtual std::optional<PostStoreProblem> change(std::span<const StoredPost* const> added,
                                                                std::span<const int64_t> removed,
                                                                bool forGood) = 0;
   [[nodiscard]] virtual std::variant<StoredPost, PostStoreProblem> read(int64_t number) = 0;
+  // No post up to that number was kept after that time.
+  [[nodiscard]] virtual std::optional<PostStoreProblem> setLatest(int64_t number, int64_t time) = 0;
+  // Numbers that the outbox keeps for itself: of the consent by which posts were collected (DiagnosticsConsent::epoch), and
+  // since when the clock says that posts are too old (seconds since 1970). 0 where none was set. A store that was never
+  // written to is made by set() alone.
+  enum class Note : int64_t { consentEpoch = 1, tooOldSince = 2 };
+  [[nodiscard]] virtual int64_t note(Note name) = 0;
+  [[nodiscard]] virtual std::optional<PostStoreProblem> setNote(Note name, int64_t value) = 0;
   // Nothing is left in it: it may give its room back to the disk.
   virtual void becameEmpty() = 0;
   // What is there is put beside, for a person to look at, and the next change begins anew. Its text: what was done.
   [[nodiscard]] virtual std::string setAside() = 0;
-  // What was put aside is gone, if there was any.
-  virtual void removeSetAside() = 0;
+  // What was put aside is gone, if there was any, and if it was last written before that time (seconds since 1970). False: it
+  // cannot be removed.
+  [[nodiscard]] virtual bool removeSetAside(int64_t before) = 0;
   virtual void close() = 0;
 };
 

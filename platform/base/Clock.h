@@ -23,6 +23,8 @@ class Clock {
   virtual ~Clock() = default;
   [[nodiscard]] virtual TimeValue timeOfDay() const = 0;
   [[nodiscard]] virtual MonotonicTime monotonic() const = 0;
+  // Goes on while the machine sleeps, which monotonic() does not.
+  [[nodiscard]] virtual Duration sinceBoot() const { return monotonic().time_since_epoch(); }
 };
 
 }  // namespace kyt

@@ -10,11 +10,15 @@ namespace kyt {
 class FakeConsent final : public DiagnosticsConsent {
  public:
   explicit FakeConsent(bool allowed = false) : allowed_(allowed) {}
-  void setAllowed(bool allowed) { allowed_ = allowed; }
+  void setAllowed(bool allowed) {
+    if (allowed_.exchange(allowed) && !allowed) ++epoch_;
+  }
+  [[nodiscard]] uint64_t epoch() override { return epoch_; }
   [[nodiscard]] bool isSubmissionAllowed() override { return allowed_; }
 
  private:
   std::atomic<bool> allowed_;
+  std::atomic<uint64_t> epoch_{1};
 };
 
 }  // namespace kyt

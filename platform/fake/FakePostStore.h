@@ -24,6 +24,9 @@ class FakePostStore : public PostStore {
     size_t changes = 0, setAside = 0;
     bool wasForGood = false;  // the last change
     bool isSetAside = false;  // something lies beside
+    bool keepsSetAside = false;
+    int64_t setAsideAt = 0;  // seconds since 1970
+    std::map<Note, int64_t> notes;
   };
   explicit FakePostStore(std::shared_ptr<Disk> disk) : disk_(std::move(disk)) {}
 
@@ -58,7 +61,7 @@ class FakePostStore : public PostStore {
     if (known == disk_->posts.end()) return PostStoreProblem{PostStoreProblem::Kind::post, "missing"};
     return known->second;
   }
-  void becameEmpty() override {}
+  void becameEmpty() override { disk_->notes.clear(); }
   [[nodiscard]] std::string setAside() override {
     ++disk_->setAside;
     disk_->isSetAside = true;
@@ -66,7 +69,23 @@ class FakePostStore : public PostStore {
     disk_->problem.reset();
     return "set aside";
   }
-  void removeSetAside() override { disk_->isSetAside = false; }
+  [[nodiscard]] bool removeSetAside(int64_t before) override {
+    if (disk_->keepsSetAside) return false;
+    if (before > disk_->setAsideAt) disk_->isSetAside = false;
+    return true;
+  }
+  [[nodiscard]] std::optional<PostStoreProblem> setLatest(int64_t number, int64_t time) override {
+    if (disk_->problem) return disk_->problem;
+    for (auto& [known, post] : disk_->posts)
+      if (known <= number && (post.keptAt == 0 || post.keptAt > time)) post.keptAt = time;
+    return std::nullopt;
+  }
+  [[nodiscard]] int64_t note(Note name) override { return disk_->problem ? 0 : disk_->notes[name]; }
+  [[nodiscard]] std::optional<PostStoreProblem> setNote(Note name, int64_t value) override {
+    if (disk_->problem) return disk_->problem;
+    disk_->notes[name] = value;
+    return std::nullopt;
+  }
   void close() override {}
 
  private:

@@ -14,6 +14,19 @@ MonotonicTime ManualClock::monotonic() const {
   return monotonic_;
 }
 
+Duration ManualClock::sinceBoot() const {
+  MutexLock lock(mutex_);
+  return monotonic_.time_since_epoch() + slept_;
+}
+
+void ManualClock::sleep(Duration duration) {
+  MutexLock lock(mutex_);
+  const MonotonicTime before = monotonic_;
+  advanceLocked(duration);
+  monotonic_ = before;
+  slept_ += duration;
+}
+
 void ManualClock::setTimeOfDay(TimeValue value) {
   MutexLock lock(mutex_);
   timeOfDay_ = value;

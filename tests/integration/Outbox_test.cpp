@@ -100,6 +100,20 @@ TEST_F(OutboxOfTheDaemon, DeletesAtItsStartWhatWasCollectedByAConsentThatIsGone)
   for (const auto& [body, times] : before) EXPECT_FALSE(taken().contains(body));
 }
 
+TEST_F(OutboxOfTheDaemon, DeletesAtOnceWhatWasCollectedByAConsentThatIsWithdrawn) {
+  settings(kOn);
+  retryAfter("86400");
+  start();
+  TestClient client(daemon_.socketPath(), kTorvel, "plain");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemon_.log();
+  EXPECT_TRUE(client.send(9, 1, Dictionary{}));
+  EXPECT_EQ(client.flush(), "flushed") << daemon_.log();
+  ASSERT_TRUE(std::filesystem::exists(folder() + "/outbox.sqlite"));
+  consent(false);
+  EXPECT_TRUE(eventually([&] { return daemon_.logged("The consent is withdrawn"); })) << daemon_.log();
+  EXPECT_TRUE(eventually([&] { return std::filesystem::is_empty(folder()); })) << daemon_.log();
+}
+
 // A few kills here; as many as KYT_OUTBOX_KILLS says by hand. Each falls at a random moment: while the daemon starts and reads
 // what is left, while posts fail and are kept, while they are sent again, while one is on its way.
 TEST_F(OutboxOfTheDaemon, LosesNothingThatItHadKeptHoweverOftenItIsKilled) {

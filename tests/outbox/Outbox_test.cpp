@@ -429,6 +429,8 @@ TEST_F(OutboxTest, CountsAgeOverARestartAndMakesNothingOldByAClockThatJumps) {
   stop();
   test_.clock.setTimeOfDay({1767225600 + 15 * 86400, 0});
   start();
+  EXPECT_EQ(row().outbox, 2U);
+  pass(minutes(95));
   EXPECT_EQ(row().droppedFor(Reason::outboxTooOld), 2U);
   EXPECT_TRUE(disk_->posts.empty());
   test_.clock.setTimeOfDay({100, 0});
@@ -438,6 +440,94 @@ TEST_F(OutboxTest, CountsAgeOverARestartAndMakesNothingOldByAClockThatJumps) {
   EXPECT_EQ(disk_->posts.size(), 1U);
   restart();
   EXPECT_EQ(disk_->posts.size(), 1U);
+}
+
+TEST_F(OutboxTest, DeletesNothingByAClockThatIsWrongForAMoment) {
+  start();
+  postAndKeep("first");
+  stop();
+  test_.clock.setTimeOfDay({4102444800, 0});  // 2100
+  start();
+  pass(minutes(50));
+  EXPECT_EQ(row().outbox, 2U);
+  test_.clock.setTimeOfDay({1767225600 + 86400, 0});
+  pass(hours(3));
+  EXPECT_EQ(row().outbox, 2U);
+  test_.clock.setTimeOfDay({4102444800, 0});
+  pass(hours(3));
+  EXPECT_EQ(row().outbox, 2U) << "while the daemon runs ages do not go by that clock";
+  restart();
+  pass(minutes(50));
+  EXPECT_EQ(row().outbox, 2U);
+  restart();
+  pass(minutes(31));
+  EXPECT_TRUE(disk_->posts.empty()) << "it has said so for an hour, over a restart";
+}
+
+TEST_F(OutboxTest, LetsWhatWasKeptBeforeTheClockWasSetGrowOldFromThenOn) {
+  test_.clock.setTimeOfDay({100, 0});
+  start();
+  postAndKeep("first");
+  stop();
+  test_.clock.setTimeOfDay({200, 0});
+  start();
+  test_.clock.setTimeOfDay({1767225600, 0});
+  pass(hours(1));
+  EXPECT_GE(disk_->posts.at(1).keptAt, 1767225600);
+  test_.clock.setTimeOfDay({1767225600 - 30 * 86400, 0});
+  postAndKeep("by a clock that lags");
+  for (int day = 0; day < 16; ++day) {
+    stop();
+    test_.clock.setTimeOfDay({1767225600 + day * 86400, 0});
+    start();
+    pass(hours(2));
+  }
+  EXPECT_TRUE(disk_->posts.empty()) << "each start does not make it new";
+}
+
+TEST_F(OutboxTest, LetsAPostGrowOldThatLiesAheadOfTheClock) {
+  test_.clock.setTimeOfDay({4102444800, 0});
+  start();
+  postAndKeep("first");
+  for (int day = 0; day < 16; ++day) {
+    stop();
+    test_.clock.setTimeOfDay({1767225600 + day * 86400, 0});
+    start();
+    pass(hours(2));
+  }
+  EXPECT_TRUE(disk_->posts.empty());
+}
+
+TEST_F(OutboxTest, LosesAnOldPostThatLiesBehindAYoungOne) {
+  start();
+  postAndKeep("young by its clock");
+  test_.clock.setTimeOfDay({1767225600 - 13 * 86400, 0});
+  postAndKeep("old by its clock");
+  stop();
+  test_.clock.setTimeOfDay({1767225600, 0});
+  start();
+  pass(hours(48));
+  ASSERT_EQ(disk_->posts.size(), 1U);
+  EXPECT_EQ(disk_->posts.begin()->second.body.view(), "young by its clock");
+}
+
+TEST_F(OutboxTest, CountsTheTimeThatTheMachineSleeps) {
+  start();
+  postAndKeep("first");
+  test_.clock.sleep(hours(24 * 15));
+  pass(hours(1));
+  EXPECT_TRUE(disk_->posts.empty());
+}
+
+TEST_F(OutboxTest, KeepsADamagedFileNoLongerThanAPost) {
+  disk_->isSetAside = true;
+  disk_->setAsideAt = 1767225600 - 15 * 86400;
+  start();
+  EXPECT_FALSE(disk_->isSetAside);
+  disk_->isSetAside = true;
+  disk_->setAsideAt = 1767225600 - 13 * 86400;
+  restart();
+  EXPECT_TRUE(disk_->isSetAside);
 }
 
 TEST_F(OutboxTest, BooksWhatLayInItAtTheStart) {
@@ -482,6 +572,65 @@ TEST_F(OutboxTest, DeletesWhatWasCollectedByAConsentThatWentWhileTheDaemonDidNot
   EXPECT_EQ(row().droppedFor(Reason::outboxConsentWithdrawn), 2U);
   pass(hours(1));
   EXPECT_EQ(sent(), 0U);
+}
+
+TEST_F(OutboxTest, DeletesAtOnceWhenTheConsentGoes) {
+  start();
+  isByConsent_ = true;
+  postAndKeep("by consent");
+  test_.consent.setAllowed(false);
+  outbox_->consentMayHaveChanged();
+  drain();
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_TRUE(disk_->wasForGood);
+}
+
+TEST_F(OutboxTest, DeletesWhatWasCollectedBeforeTheConsentWasWithdrawnAndGivenAgain) {
+  for (const bool runs : {true, false}) {
+    start();
+    isByConsent_ = true;
+    postAndKeep("by the first");
+    postAndKeep("by the first, too");
+    if (!runs) stop();
+    test_.consent.setAllowed(false);
+    test_.consent.setAllowed(true);
+    if (!runs) start();
+    pass(Outbox::kLongestRest);
+    EXPECT_TRUE(disk_->posts.empty()) << runs;
+    postAndKeep("by the second");
+    restart();
+    EXPECT_EQ(disk_->posts.size(), 1U) << runs;
+    EXPECT_EQ(outbox_->drop({}), 1U);
+    stop();
+  }
+}
+
+TEST_F(OutboxTest, DeletesAfterARestartWhatTheDiskWouldNotLetGo) {
+  start();
+  isByConsent_ = true;
+  postAndKeep("by the first");
+  test_.consent.setAllowed(false);
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read only"};
+  pass(Outbox::kLongestRest);
+  stop();
+  disk_->problem.reset();
+  test_.consent.setAllowed(true);
+  ASSERT_EQ(disk_->posts.size(), 1U);
+  start();
+  pass(hours(1));
+  EXPECT_TRUE(disk_->posts.empty());
+  EXPECT_EQ(sent(), 0U);
+}
+
+TEST_F(OutboxTest, TriesAgainToRemoveADamagedFileWhenTheConsentGoes) {
+  disk_->isSetAside = disk_->keepsSetAside = true;
+  start();
+  test_.consent.setAllowed(false);
+  outbox_->consentMayHaveChanged();
+  drain();
+  disk_->keepsSetAside = false;
+  pass(Outbox::kLongestRest);
+  EXPECT_FALSE(disk_->isSetAside);
 }
 
 TEST_F(OutboxTest, CancelsWhatIsOnItsWayWhenTheConsentGoes) {

@@ -116,6 +116,7 @@ allow = [
   "mkdir", "mkdirat",                 # the message log's folder; elsewhere Landlock refuses what is not there
   "rename", "renameat", "renameat2", "unlink", "unlinkat", "fsync", "fdatasync", "ftruncate", "flock",
   "fchmod", "fchown",
+  "inotify_init1", "inotify_add_watch",   # the outbox learns at once that the owner has withdrawn the consent
   "fcntl(*, F_GETFL)", "fcntl(*, F_SETFL)", "fcntl(*, F_GETFD)", "fcntl(*, F_SETFD)", "fcntl(*, F_DUPFD_CLOEXEC)",
   "fcntl(*, F_GETLK)", "fcntl(*, F_SETLK)", "fcntl(*, F_SETLKW)",
   "fcntl(*, F_OFD_GETLK)", "fcntl(*, F_OFD_SETLK)", "fcntl(*, F_OFD_SETLKW)",

@@ -9,6 +9,7 @@ class LinuxClock final : public Clock {
  public:
   [[nodiscard]] TimeValue timeOfDay() const override;
   [[nodiscard]] MonotonicTime monotonic() const override;
+  [[nodiscard]] Duration sinceBoot() const override;
 };
 
 }  // namespace kyt

@@ -252,4 +252,15 @@ std::vector<std::string> devicePropertyKeys() {
           "SerialNumber",   "UniqueDeviceID", "ReleaseType", "country"};
 }
 
+uint64_t DefaultsDiagnosticsConsent::epoch() {
+  const FileIdentity identity = identityOf(file_);
+  constexpr uint64_t kPrime = 1099511628211U;
+  uint64_t epoch = 14695981039346656037U;
+  for (const auto part :
+       {identity.inode, static_cast<uint64_t>(identity.size), static_cast<uint64_t>(identity.modifiedSeconds),
+        static_cast<uint64_t>(identity.modifiedNanoseconds)})
+    epoch = (epoch ^ part) * kPrime;
+  return std::max<uint64_t>(epoch, 1);
+}
+
 }  // namespace kyt

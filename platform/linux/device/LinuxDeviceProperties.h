@@ -70,16 +70,21 @@ class LinuxDeviceProperties final : public DeviceProperties {
 // Every key that device.toml may have.
 [[nodiscard]] std::vector<std::string> devicePropertyKeys();
 
-// The user default "consent" of the diagnostics domain; no value is no.
+// The user default "consent" of the diagnostics domain; no value is no. Its epoch is another one whenever the domain's file
+// was written, since that may have been for no and yes.
 class DefaultsDiagnosticsConsent final : public DiagnosticsConsent {
  public:
-  explicit DefaultsDiagnosticsConsent(UserDefaults& defaults) : defaults_(defaults) {}
+  // `file`: the domain's; empty: its epoch is of no interest.
+  explicit DefaultsDiagnosticsConsent(UserDefaults& defaults, std::string file = "")
+      : defaults_(defaults), file_(std::move(file)) {}
   [[nodiscard]] bool isSubmissionAllowed() override {
     return defaults_.value(kDiagnosticsDefaultsDomain, "consent").boolValue();
   }
+  [[nodiscard]] uint64_t epoch() override;
 
  private:
   UserDefaults& defaults_;
+  const std::string file_;
 };
 
 }  // namespace kyt

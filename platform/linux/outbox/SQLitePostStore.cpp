@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstdio>
@@ -19,6 +20,8 @@ namespace {
 using Kind = PostStoreProblem::Kind;
 
 constexpr char kAside[] = ".damaged";
+// A note of this file alone: its pages that hold nothing are overwritten.
+constexpr char kIsClean[] = "SELECT value FROM notes WHERE name = 3";
 constexpr off_t kWorthGivingBack = 1 << 20;  // bytes
 // Rows that the disk does not let be deleted in one change; more are no matter of the rows.
 constexpr unsigned kMostStuck = 16;
@@ -40,6 +43,7 @@ void SQLitePostStore::close() {
     sqlite_->finalize(std::exchange(*statement, nullptr));
   sqlite_->close(std::exchange(database_, nullptr));
   gone_.clear();
+  latest_.clear();
   failedChanges_ = 0;
 }
 
@@ -130,10 +134,12 @@ SQLitePostStore::Problem SQLitePostStore::remove(int64_t number) {
 }
 
 SQLitePostStore::Problem SQLitePostStore::makeChange(std::span<const StoredPost* const> added,
-                                                     std::span<const int64_t> removed) {
+                                                     std::span<const int64_t> removed, bool forGood) {
   if (Problem wrong = execute("BEGIN IMMEDIATE")) return wrong;
   for (const int64_t number : removed)
     if (Problem wrong = remove(number)) return wrong;
+  if (!removed.empty() && !forGood)
+    if (Problem wrong = execute("DELETE FROM notes WHERE name = 3")) return wrong;
   for (const StoredPost* post : added)
     if (Problem wrong = add(*post)) return wrong;
   return execute("COMMIT");
@@ -141,6 +147,7 @@ SQLitePostStore::Problem SQLitePostStore::makeChange(std::span<const StoredPost*
 
 std::optional<PostStoreProblem> SQLitePostStore::change(std::span<const StoredPost* const> added,
                                                         std::span<const int64_t> removed, bool forGood) {
+  if (added.empty() && removed.empty() && !isThere()) return std::nullopt;
   if (Problem wrong = begin()) return wrong;
   if (forGood)
     if (Problem wrong = execute("PRAGMA secure_delete=ON")) return wrong;
@@ -148,7 +155,7 @@ std::optional<PostStoreProblem> SQLitePostStore::change(std::span<const StoredPo
   std::vector<int64_t> stuck;
   do {
     stuck_.reset();
-    wrong = makeChange(added, removed);
+    wrong = makeChange(added, removed, forGood);
     if (wrong && sqlite_->isAutoCommit(database_) == 0)
       static_cast<void>(sqlite_->execute(database_, "ROLLBACK", nullptr, nullptr, nullptr));
     if (wrong && stuck_) stuck.push_back(*stuck_);
@@ -162,7 +169,7 @@ std::optional<PostStoreProblem> SQLitePostStore::change(std::span<const StoredPo
   if (forGood) {
     // The log still has what was there.
     static_cast<void>(execute("PRAGMA secure_delete=FAST"));
-    if (!wrong) wrong = execute("PRAGMA wal_checkpoint(TRUNCATE)");
+    if (!wrong) wrong = overwriteFree();
   }
   return wrong;
 }
@@ -197,17 +204,81 @@ std::variant<StoredPost, PostStoreProblem> SQLitePostStore::read(int64_t number)
   return result;
 }
 
+bool SQLitePostStore::isThere() const {
+  return ::access(file_.c_str(), F_OK) == 0;
+}
+
+// What was removed before lies in pages that hold nothing now. Rows of zeros take them all, and are removed again.
+SQLitePostStore::Problem SQLitePostStore::overwriteFree() {
+  // A row of so many bytes more than its pages hold fills each of them to its end.
+  constexpr int64_t kMostPages = 1024, kBytesOfAPage = 508, kInTheTable = 40;
+  std::optional<int64_t> posts, free, isClean;
+  if (Problem wrong = query("SELECT 1 FROM posts LIMIT 1", posts)) return wrong;
+  if (!posts) {
+    removeFile();
+    return std::nullopt;
+  }
+  if (Problem wrong = query(kIsClean, isClean)) return wrong;
+  if (isClean) return execute("PRAGMA wal_checkpoint(TRUNCATE)");
+  for (;;) {
+    if (Problem wrong = query("PRAGMA freelist_count", free)) return wrong;
+    if (free.value_or(0) == 0) break;
+    const std::string bytes = std::to_string(std::min(*free, kMostPages) * kBytesOfAPage + kInTheTable);
+    if (Problem wrong = execute(("INSERT INTO filler VALUES (NULL, zeroblob(" + bytes + "))").c_str()))
+      return wrong;
+  }
+  if (Problem wrong =
+          execute("BEGIN IMMEDIATE; DELETE FROM filler; INSERT OR REPLACE INTO notes VALUES (3, 1);"
+                  "COMMIT"))
+    return wrong;
+  return execute("PRAGMA wal_checkpoint(TRUNCATE)");
+}
+
+std::optional<PostStoreProblem> SQLitePostStore::setLatest(int64_t number, int64_t time) {
+  if (Problem wrong = begin()) return wrong;
+  const std::string row = std::to_string(number) + ", " + std::to_string(time);
+  Problem wrong = execute(("BEGIN IMMEDIATE; INSERT OR REPLACE INTO latest VALUES (" + row +
+                           "); DELETE FROM latest WHERE number < (SELECT min(number) FROM posts); COMMIT")
+                              .c_str());
+  if (wrong && sqlite_->isAutoCommit(database_) == 0)
+    static_cast<void>(sqlite_->execute(database_, "ROLLBACK", nullptr, nullptr, nullptr));
+  if (!wrong) latest_[number] = time;
+  return wrong;
+}
+
+int64_t SQLitePostStore::note(Note name) {
+  std::optional<int64_t> value;
+  if (!isThere() || begin() ||
+      query("SELECT value FROM notes WHERE name = ?", value, 0, static_cast<int64_t>(name)))
+    return 0;
+  return value.value_or(0);
+}
+
+std::optional<PostStoreProblem> SQLitePostStore::setNote(Note name, int64_t value) {
+  if (Problem wrong = begin()) return wrong;
+  return execute(("INSERT OR REPLACE INTO notes VALUES (" + std::to_string(static_cast<int64_t>(name)) +
+                  ", " + std::to_string(value) + ")")
+                     .c_str());
+}
+
 void SQLitePostStore::becameEmpty() {
   struct stat status {};
   if (::stat(file_.c_str(), &status) != 0) return;
   if (status.st_size < kWorthGivingBack && gone_.empty()) return;
+  removeFile();
+}
+
+void SQLitePostStore::removeFile() {
   close();
   static_cast<void>(::unlink(file_.c_str()));
   static_cast<void>(::unlink((file_ + "-wal").c_str()));
 }
 
-void SQLitePostStore::removeSetAside() {
-  static_cast<void>(::unlink((file_ + kAside).c_str()));
+bool SQLitePostStore::removeSetAside(int64_t before) {
+  const std::string aside = file_ + kAside;
+  struct stat status {};
+  if (::lstat(aside.c_str(), &status) != 0) return errno == ENOENT;
+  return status.st_mtime >= before || ::unlink(aside.c_str()) == 0;
 }
 
 std::string SQLitePostStore::setAside() {

@@ -9,6 +9,7 @@
 // body is read, and one of all. A log of which frames are damaged that were whole once is seen as well.
 #pragma once
 
+#include <map>
 #include <optional>
 #include <set>
 #include <span>
@@ -35,9 +36,12 @@ class SQLitePostStore final : public PostStore {
                                                        std::span<const int64_t> removed,
                                                        bool forGood) override;
   [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override;
+  [[nodiscard]] std::optional<PostStoreProblem> setLatest(int64_t number, int64_t time) override;
+  [[nodiscard]] int64_t note(Note name) override;
+  [[nodiscard]] std::optional<PostStoreProblem> setNote(Note name, int64_t value) override;
   void becameEmpty() override;
   [[nodiscard]] std::string setAside() override;
-  void removeSetAside() override;
+  [[nodiscard]] bool removeSetAside(int64_t before) override;
   void close() override;
 
   [[nodiscard]] const std::string& file() const { return file_; }
@@ -51,6 +55,11 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] Problem prepareFile();
   [[nodiscard]] Problem checkVersion();
   [[nodiscard]] Problem readGone();
+  [[nodiscard]] Problem readLatest();
+  [[nodiscard]] int64_t timeOf(int64_t number, int64_t keptAt) const;
+  // All pages that hold nothing are overwritten, or the whole file is gone where no post is left.
+  [[nodiscard]] Problem overwriteFree();
+  void removeFile();
   // The first column of its first row; none: there is no row, or null in it.
   [[nodiscard]] Problem query(const char* sql, std::optional<int64_t>& value, int column = 0,
                               std::optional<int64_t> parameter = std::nullopt);
@@ -63,8 +72,9 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] Problem prepare(sqlite3_stmt*& statement, const char* sql);
   [[nodiscard]] Problem add(const StoredPost& post);
   [[nodiscard]] Problem remove(int64_t number);
-  [[nodiscard]] Problem makeChange(std::span<const StoredPost* const> added,
-                                   std::span<const int64_t> removed);
+  [[nodiscard]] Problem makeChange(std::span<const StoredPost* const> added, std::span<const int64_t> removed,
+                                   bool forGood);
+  [[nodiscard]] bool isThere() const;
   [[nodiscard]] Problem run(sqlite3_stmt* statement);
   // It failed at one page, others may be well.
   [[nodiscard]] static bool isOfAPlace(int code);
@@ -78,8 +88,9 @@ class SQLitePostStore final : public PostStore {
   std::optional<SQLiteLibrary> sqlite_;
   sqlite3* database_ = nullptr;
   sqlite3_stmt *insert_ = nullptr, *delete_ = nullptr, *select_ = nullptr, *mark_ = nullptr;
-  std::set<int64_t> gone_;        // rows that could not be deleted
-  std::optional<int64_t> stuck_;  // the one that the last change could not delete
+  std::set<int64_t> gone_;             // rows that could not be deleted
+  std::map<int64_t, int64_t> latest_;  // setLatest()
+  std::optional<int64_t> stuck_;       // the one that the last change could not delete
   bool isLogDamaged_ = false;
   unsigned failedChanges_ = 0;  // in a row
 };

@@ -36,12 +36,16 @@ constexpr char kBeginning[] =
 constexpr char kTables[] =
     "BEGIN IMMEDIATE; CREATE TABLE posts (number INTEGER PRIMARY KEY, checksum INTEGER NOT NULL,"
     " record BLOB NOT NULL, body BLOB NOT NULL, head INTEGER);"
-    "CREATE TABLE gone (number INTEGER PRIMARY KEY);"
+    "CREATE TABLE gone (number INTEGER PRIMARY KEY); CREATE TABLE latest (number INTEGER PRIMARY KEY,"
+    " time INTEGER NOT NULL); CREATE TABLE notes (name INTEGER PRIMARY KEY, value INTEGER NOT NULL);"
+    "CREATE TABLE filler (number INTEGER PRIMARY KEY, bytes BLOB NOT NULL);"
     "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
 // Rows of the first version have no checksum of their head: the other one is looked at.
 constexpr char kFromTheFirst[] =
     "BEGIN IMMEDIATE; ALTER TABLE posts ADD COLUMN head INTEGER;"
-    "CREATE TABLE gone (number INTEGER PRIMARY KEY);"
+    "CREATE TABLE gone (number INTEGER PRIMARY KEY); CREATE TABLE latest (number INTEGER PRIMARY KEY,"
+    " time INTEGER NOT NULL); CREATE TABLE notes (name INTEGER PRIMARY KEY, value INTEGER NOT NULL);"
+    "CREATE TABLE filler (number INTEGER PRIMARY KEY, bytes BLOB NOT NULL);"
     "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
 static_assert((kApplication | SQLitePostStore::kVersion) == 1264145410);
 
@@ -157,7 +161,8 @@ SQLitePostStore::Problem SQLitePostStore::prepareFile() {
   if (Problem wrong = prepare(mark_, "INSERT OR IGNORE INTO gone VALUES (?)")) return wrong;
   if (Problem wrong = prepare(select_, "SELECT checksum, record, body FROM posts WHERE number = ?"))
     return wrong;
-  return readGone();
+  if (Problem wrong = readGone()) return wrong;
+  return readLatest();
 }
 
 // It stands in the file twice, so that one that is damaged is not taken for a later one.
@@ -184,6 +189,25 @@ SQLitePostStore::Problem SQLitePostStore::readGone() {
   return wrong;
 }
 
+SQLitePostStore::Problem SQLitePostStore::readLatest() {
+  sqlite3_stmt* all = nullptr;
+  if (Problem wrong = prepare(all, "SELECT number, time FROM latest")) return wrong;
+  int code = SQLITE_ROW;
+  while ((code = sqlite_->step(all)) == SQLITE_ROW)
+    latest_[sqlite_->columnInteger(all, 0)] = sqlite_->columnInteger(all, 1);
+  Problem wrong;
+  if (code != SQLITE_DONE) wrong = problem(code, file_.c_str());
+  sqlite_->finalize(all);
+  return wrong;
+}
+
+// A post's own time is that of a clock that may not have been set, or wrong.
+int64_t SQLitePostStore::timeOf(int64_t number, int64_t keptAt) const {
+  for (auto latest = latest_.lower_bound(number); latest != latest_.end(); ++latest)
+    if (keptAt == 0 || latest->second < keptAt) keptAt = latest->second;
+  return keptAt;
+}
+
 // Columns: number, record, size of the body, checksum of the head (null: of a file of the first version).
 StoredPostHead SQLitePostStore::headOf(sqlite3_stmt* row) {
   const int64_t number = sqlite_->columnInteger(row, 0);
@@ -199,6 +223,7 @@ StoredPostHead SQLitePostStore::headOf(sqlite3_stmt* row) {
     return head;
   }
   post->number = number;
+  post->keptAt = timeOf(number, post->keptAt);
   head.bytes = PostStore::bytesOf(*post) + static_cast<uint64_t>(sqlite_->columnInteger(row, 2));
   head.isUnreadable = false;
   head.post = std::move(*post);

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <filesystem>
 #include <thread>
 #include <vector>
 
@@ -268,6 +269,20 @@ TEST_F(LinuxDevicePropertiesTest, AnotherLocaltimeFileCountsFromTheNextMinute) {
               return std::to_string(properties.secondsFromGMT({1774746000, 0}));
             }),
             "19800");
+}
+
+TEST(DefaultsDiagnosticsConsent, HasAnotherEpochAfterItWasWithdrawnAndGivenAgain) {
+  const TemporaryFolder folder;
+  FakeUserDefaults defaults;
+  DefaultsDiagnosticsConsent consent(defaults, folder / "consent.toml");
+  const uint64_t none = consent.epoch();
+  folder.write("consent.toml", "consent = true\n");
+  const uint64_t first = consent.epoch();
+  EXPECT_NE(first, none);
+  EXPECT_EQ(consent.epoch(), first);
+  folder.write("another.toml", "consent = true\n");
+  std::filesystem::rename(folder / "another.toml", folder / "consent.toml");
+  EXPECT_NE(consent.epoch(), first);
 }
 
 TEST(DefaultsDiagnosticsConsent, IsTheUserDefaultAndNoValueIsNo) {

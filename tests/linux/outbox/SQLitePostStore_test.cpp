@@ -60,6 +60,16 @@ void expectSame(const StoredPost& a, const StoredPost& b) {
   EXPECT_EQ(a.body, b.body);
 }
 
+// Bytes that this process has handed to write and its kind.
+uint64_t written() {
+  std::ifstream figures("/proc/self/io");
+  std::string name;
+  uint64_t bytes = 0;
+  while (figures >> name >> bytes)
+    if (name == "wchar:") return bytes;
+  return 0;
+}
+
 class SQLitePostStoreTest : public testing::Test {
  protected:
   static std::optional<PostStoreProblem> add(PostStore& store, const StoredPost& post) {
@@ -371,6 +381,59 @@ TEST_F(SQLitePostStoreTest, LeavesNothingOnTheDiskOfWhatWasRemovedForGood) {
   EXPECT_EQ(numbersIn(store), std::vector<int64_t>({2}));
 }
 
+TEST_F(SQLitePostStoreTest, LeavesNothingOnTheDiskOfWhatWasRemovedBefore) {
+  SQLitePostStore store(folder_.path());
+  std::vector<int64_t> sent;
+  for (int64_t number = 1; number <= 60; ++number) {
+    StoredPost post = somePost(number);
+    if (number % 6 != 0) {
+      post.body = Data("what nobody may read any more" + std::string(static_cast<size_t>(number) * 400, 's'));
+      sent.push_back(number);
+    }
+    ASSERT_FALSE(add(store, post));
+  }
+  ASSERT_FALSE(remove(store, sent));
+  store.close();
+  ASSERT_EQ(numbersIn(store).size(), 10U);
+  EXPECT_NE(bytesOnDisk().find("ssssssss"), std::string::npos) << "in pages that hold nothing";
+  const auto size = std::filesystem::file_size(file());
+  const uint64_t before = written();
+  ASSERT_FALSE(remove(store, {}, true));
+  const uint64_t cost = written() - before;
+  std::printf("%.2f bytes written for each byte of the file\n",
+              static_cast<double>(cost) / static_cast<double>(size));
+  EXPECT_EQ(bytesOnDisk().find("ssssssss"), std::string::npos);
+  EXPECT_EQ(bytesOnDisk().find("nobody may read"), std::string::npos);
+  EXPECT_EQ(numbersIn(store).size(), 10U);
+  EXPECT_LE(std::filesystem::file_size(file()), size + 65536);
+  const uint64_t again = written();
+  ASSERT_FALSE(remove(store, {}, true));
+  EXPECT_LE(written() - again, 4096U) << "once is enough";
+  std::vector<int64_t> rest = numbersIn(store);
+  ASSERT_FALSE(remove(store, rest, true));
+  EXPECT_TRUE(std::filesystem::is_empty(folder_.path())) << "no post is left";
+}
+
+TEST_F(SQLitePostStoreTest, KnowsTheLatestTimeAtWhichAPostWasKept) {
+  {
+    SQLitePostStore store(folder_.path());
+    for (int64_t number = 1; number <= 6; ++number) {
+      StoredPost post = somePost(number);
+      post.keptAt = number == 2 ? 4102444800 : number % 2 == 0 ? 0 : 1000 * number;
+      ASSERT_FALSE(add(store, post));
+    }
+    EXPECT_FALSE(store.setLatest(2, 7000));
+    EXPECT_FALSE(store.setLatest(4, 9000));
+    EXPECT_FALSE(store.setNote(PostStore::Note::consentEpoch, 77));
+    EXPECT_EQ(store.note(PostStore::Note::tooOldSince), 0);
+  }
+  SQLitePostStore store(folder_.path());
+  std::vector<int64_t> times;
+  EXPECT_FALSE(store.open([&times](const StoredPostHead& head) { times.push_back(head.post.keptAt); }));
+  EXPECT_EQ(times, std::vector<int64_t>({1000, 7000, 3000, 9000, 5000, 0}));
+  EXPECT_EQ(store.note(PostStore::Note::consentEpoch), 77);
+}
+
 TEST_F(SQLitePostStoreTest, GivesItsRoomBackWhenItIsEmpty) {
   SQLitePostStore store(folder_.path());
   std::vector<int64_t> numbers;
@@ -383,16 +446,6 @@ TEST_F(SQLitePostStoreTest, GivesItsRoomBackWhenItIsEmpty) {
   EXPECT_TRUE(std::filesystem::is_empty(folder_.path()));
   EXPECT_FALSE(add(store, somePost(31)));
   EXPECT_EQ(numbersIn(store), std::vector<int64_t>({31}));
-}
-
-// Bytes that this process has handed to write and its kind.
-uint64_t written() {
-  std::ifstream figures("/proc/self/io");
-  std::string name;
-  uint64_t bytes = 0;
-  while (figures >> name >> bytes)
-    if (name == "wchar:") return bytes;
-  return 0;
 }
 
 // All of a post's life: kept, sent, forgotten, in changes as the outbox makes them.
