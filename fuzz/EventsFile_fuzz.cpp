@@ -1,6 +1,6 @@
 // What programs say that they report (events.toml). What is checked besides memory: errors are plain lines that begin with
-// the file's name, a file that is taken keeps its bounds and has no event twice, and comparing it with a storebag tells
-// findings of plain text.
+// the file's name, a file that is taken keeps its bounds and has no event twice, comparing it with a storebag tells
+// findings of plain text, and what is made of it is UTF-8.
 #include <cstdint>
 #include <cstdlib>
 #include <set>
@@ -12,6 +12,7 @@
 #include "platform/base/TextEscape.h"
 #include "tools/events/EventsCheck.h"
 #include "tools/events/EventsFile.h"
+#include "tools/events/Generate.h"
 
 namespace kyt::tools {
 namespace {
@@ -44,6 +45,8 @@ void check(const EventsFile& file) {
     for (const EventField& field : event.fields)
       require(isPlainText(field.name) && fields.insert(field.name).second);
   }
+  for (const EventsLanguage language : {EventsLanguage::c, EventsLanguage::cxx, EventsLanguage::python})
+    require(isValidUTF8(generateEvents(file, language)));
   for (const EventFinding& finding : checkEvents(file, bag()).findings) require(isPlainText(finding.text));
 }
 

@@ -77,6 +77,12 @@ TEST(EventsWithNames, TheCommandsTellWhetherTheStorebagFits) {
   const std::string commands = blockOf("PROGRAMS.md", "sh example=events");
   const ProgramRun fits = shell(folder.path(), commands);
   EXPECT_EQ(fits.status, 0) << fits.text;
+  const ProgramRun generated = shell(folder.path(), blockOf("PROGRAMS.md", "sh example=generate"));
+  EXPECT_EQ(generated.status, 0) << generated.text;
+  for (const auto& [name, what] :
+       {std::pair("events.h", "kyt_send_event_page_opened("),
+        std::pair("events.hpp", "namespace kyt::events {\n"), std::pair("events.py", "class PageOpened:\n")})
+    EXPECT_NE(folder.read(name).find(what), std::string::npos) << name;
   ASSERT_NE(bag.find(hashed), std::string::npos);
   folder.write("bag.toml", std::string(bag).replace(bag.find(hashed), hashed.size(), "\"keep\""));
   const ProgramRun gap = shell(folder.path(), commands);

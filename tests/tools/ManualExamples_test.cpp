@@ -204,6 +204,15 @@ TEST_F(ManualProgramsOnAStage, OfTheLibraryCompileAndReport) {
   EXPECT_TRUE(arrive("client=example&method=10&status=1", 2)) << daemonLog();
 }
 
+TEST_F(ManualProgramsOnAStage, OfEventsWithNamesCompilesAndReports) {
+  ASSERT_FALSE(tools::writeFile(stage_->folder() + "/events.toml",
+                                exampleOf("kytreporting-events.toml.5", "events"), 0644));
+  ASSERT_EQ(shell("kytctl events generate events.toml --lang c++ -o events.h").text, "");
+  ASSERT_EQ(compile("events", "c++", exampleOf("kytreporting-events.toml.5", "program")), "");
+  EXPECT_EQ(shell(stage_->folder() + "/events").status, 0);
+  EXPECT_TRUE(arrive("client=example&service=demo&method=10&status=1", 1)) << daemonLog();
+}
+
 TEST_F(ManualProgramsOnAStage, OfTheProgrammersGuideCompileAndReport) {
   ASSERT_EQ(compile("guide", "c++",
                     "#include <kytreporting/KYTReporting.h>\nint main() {\n" + blockOf("PROGRAMS.md", "cpp") +

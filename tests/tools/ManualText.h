@@ -91,8 +91,8 @@ inline Help helpOf(const std::string& program, std::vector<std::string> command 
     }
     if (std::regex_search(line, match, std::regex("^  (--[a-z-]+)(?:  | Excludes:|$)")))
       help.flags.insert(match[1]);
-    if (std::regex_search(line, match, std::regex("^  (--[a-z-]+) TEXT:\\{([a-z,]+)\\}")))
-      help.values[match[1]] = matchesIn(match[2], "([a-z]+)");
+    if (std::regex_search(line, match, std::regex("^  (--[a-z-]+) TEXT:\\{([a-z,+]+)\\}")))
+      help.values[match[1]] = matchesIn(match[2], "([a-z+]+)");
   }
   return help;
 }

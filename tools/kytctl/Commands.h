@@ -108,6 +108,12 @@ struct EventsOptions {
   bool json = false;
 };
 
+struct GenerateOptions {
+  std::string file;          // events.toml
+  std::string language;      // "c", "c++", "python"
+  std::string output = "-";  // "-": standard output
+};
+
 struct SimulateOptions {
   std::string bag, events;  // files
   uint32_t devices = 1000;
@@ -163,6 +169,8 @@ struct SimulateOptions {
 
 // Tells what a program reports that a bag leaves unguarded or does not take: 0 nothing, 1 something; 2: that cannot be told.
 [[nodiscard]] int checkEventsCommand(const EventsOptions& options);
+// Writes source code that fills and sends these events.
+[[nodiscard]] int generateEventsCommand(const GenerateOptions& options);
 
 // Tells how many sessions and events of many devices leave by that bag.
 [[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);

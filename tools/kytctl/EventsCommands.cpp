@@ -7,6 +7,7 @@
 #include "tools/StorebagFile.h"
 #include "tools/events/EventsCheck.h"
 #include "tools/events/EventsFile.h"
+#include "tools/events/Generate.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/StorebagServices.h"
 
@@ -57,6 +58,21 @@ void printJSON(JSON& json, const EventsFile& file, const std::string& bag, const
   std::printf("%s\n", text.c_str());
 }
 
+int write(const std::string& text, const std::string& output) {
+  if (output == "-") {
+    const bool isWritten =
+        std::fwrite(text.data(), 1, text.size(), stdout) == text.size() && std::fflush(stdout) == 0;
+    return isWritten ? 0 : failed("standard output takes no more");
+  }
+  if (auto error = writeFile(output, text, 0644)) return failed(*error);
+  return 0;
+}
+
+EventsLanguage languageNamed(const std::string& name) {
+  if (name == "c") return EventsLanguage::c;
+  return name == "python" ? EventsLanguage::python : EventsLanguage::cxx;
+}
+
 }  // namespace
 
 int checkEventsCommand(const EventsOptions& options) {
@@ -78,6 +94,19 @@ int checkEventsCommand(const EventsOptions& options) {
   else
     print(file, verdict);
   return verdict.findings.empty() ? 0 : 1;
+}
+
+int generateEventsCommand(const GenerateOptions& options) {
+  const auto read = readEvents(options.file);
+  if (const auto* problems = std::get_if<EventsProblems>(&read)) {
+    tell(*problems);
+    return 1;
+  }
+  const EventsFile& file = std::get<EventsFile>(read);
+  for (const DeclaredEvent& event : file.events)
+    if (event.category == 0)
+      return failed(tomlError(options.file, event.line, "category 0 is the daemon's own").text);
+  return write(generateEvents(file, languageNamed(options.language)), options.output);
 }
 
 }  // namespace kyt::tools

@@ -27,6 +27,7 @@ struct Arguments {
   ExplainOptions explain;
   SimulateOptions simulate;
   EventsOptions events;
+  GenerateOptions generate;
   PublishOptions publish;
   ProbeOptions probe;
   RingOptions ring;
@@ -305,6 +306,11 @@ void addEvents(const Command& program, Arguments& a) {
   check.flag("--json", a.events.json, "Print one JSON object");
   check.ends(kEventsChecked);
   check.runs([&a] { a.status = checkEventsCommand(a.events); });
+  const Command generate = events.command("generate", "Write source code that fills and sends its events");
+  generate.option("file", a.generate.file, "What the program reports, events.toml").required();
+  generate.option("--lang", a.generate.language, "The language").required().oneOf({"c", "c++", "python"});
+  generate.option("-o,--output", a.generate.output, "Where it goes; without it, and with -, standard output");
+  generate.runs([&a] { a.status = generateEventsCommand(a.generate); });
 }
 
 void addWindow(const Command& program, Arguments& a) {

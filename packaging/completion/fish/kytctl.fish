@@ -9,7 +9,7 @@ function __kytctl_words
         else if contains -- $word --root --socket --timeout --client-type --session-id --client-version --category \
                 --payload --user-info --type --pid --user --bits --key -o --output --public-key --session-info --client \
                 --service --storebag --program --draw --events --devices --seed \
-                --serial --expires-in-days --to --name --ca-file --identifier --set --server
+                --serial --expires-in-days --to --name --lang --ca-file --identifier --set --server
             set value 1
         else if not string match -q -- '-*' $word
             echo $word
@@ -106,7 +106,7 @@ complete -c kytctl -n '__kytctl_at owner' -a 'show export erase'
 complete -c kytctl -n '__kytctl_at -b owner show' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
-complete -c kytctl -n '__kytctl_at events' -a check
+complete -c kytctl -n '__kytctl_at events' -a 'check generate'
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate publish diff probe'
 
 complete -c kytctl -n '__kytctl_at -b listen' -l socket -r -F -d 'Where to listen'
@@ -172,5 +172,7 @@ complete -c kytctl -n '__kytctl_at -b storebag simulate' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storebag show" "storebag simulate" "storebag publish" "storebag diff"' -F
 complete -c kytctl -n '__kytctl_due 2 "storebag diff"' -F
 complete -c kytctl -n '__kytctl_at -b events check' -l json -d 'Print JSON'
-complete -c kytctl -n '__kytctl_due 1 "events check"' -F
+complete -c kytctl -n '__kytctl_at -b events generate' -l lang -x -a 'c c++ python' -d 'The language'
+complete -c kytctl -n '__kytctl_at -b events generate' -s o -l output -r -F -d 'Where it goes'
+complete -c kytctl -n '__kytctl_due 1 "events check" "events generate"' -F
 complete -c kytctl -n '__kytctl_due 2 "events check"' -F
