@@ -16,6 +16,12 @@ struct SourceEvent {
   Dictionary payload;
 };
 
+// Of one that `kytctl events generate` has made.
+template <typename Generated>
+[[nodiscard]] SourceEvent sourceEvent(const Generated& event) {
+  return {Generated::kCategory, Generated::kType, event.payload()};
+}
+
 class Summary {
  public:
   explicit Summary(uint32_t category) : category_(category) {}

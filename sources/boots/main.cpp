@@ -14,6 +14,7 @@
 #include "sources/State.h"
 #include "sources/Waiting.h"
 #include "sources/boots/EndedBoots.h"
+#include "sources/boots/Events.h"
 
 namespace kyt::sources {
 namespace {
@@ -22,7 +23,6 @@ using std::chrono::seconds;
 using std::chrono::steady_clock;
 
 constexpr char kName[] = "kytsource-boots";
-constexpr uint32_t kCategory = 303, kEnded = 1, kBegan = 2;
 constexpr uint64_t kMicroseconds = 1'000'000;
 constexpr size_t kMostBoots = 100;  // in one report; of more, the latest
 
@@ -99,30 +99,27 @@ class Boots {
     if (isFirst) ended.boots.clear();
     if (ended.boots.size() > kMostBoots)
       ended.boots.erase(ended.boots.begin(), ended.boots.end() - static_cast<ptrdiff_t>(kMostBoots));
-    const std::vector<SourceEvent> events = eventsOf(ended.boots, told.began != current_, state.report);
-    const std::vector<bool> taken = delivery_.deliver(events);
+    const std::vector<SourceEvent> found = eventsOf(ended.boots, told.began != current_, state.report);
+    const std::vector<bool> taken = delivery_.deliver(found);
     if (std::find(taken.begin(), taken.end(), false) != taken.end())
       return tell("the report waits: " + delivery_.problem());
-    if (!events.empty()) ++state.report;
+    if (!found.empty()) ++state.report;
     state.position = "@" + std::to_string(told.until) + ";" + current_;
     if (const auto problem = writeState(options_.state, state)) tell(*problem);
     return true;
   }
   [[nodiscard]] std::vector<SourceEvent> eventsOf(const std::vector<EndedBoot>& boots, bool tellsBegin,
                                                   uint64_t report) const {
-    std::vector<SourceEvent> events;
+    std::vector<SourceEvent> told;
     for (const EndedBoot& boot : boots)
-      events.push_back({kCategory, kEnded,
-                        Dictionary{{"reason", boot.reason},
-                                   {"seconds", (boot.ended - boot.began) / kMicroseconds},
-                                   {"ended", boot.ended / kMicroseconds},
-                                   {"report", report}}});
-    if (!tellsBegin) return events;
-    SourceEvent began{kCategory, kBegan, Dictionary{{"report", report}}};
-    if (const auto startup = startupMilliseconds(options_.journal, current_))
-      began.payload.set("startupMilliseconds", *startup);
-    events.push_back(std::move(began));
-    return events;
+      told.push_back(sourceEvent(events::BootEnded{.reason = boot.reason,
+                                                   .seconds = (boot.ended - boot.began) / kMicroseconds,
+                                                   .ended = boot.ended / kMicroseconds,
+                                                   .report = report}));
+    if (tellsBegin)
+      told.push_back(sourceEvent(events::BootBegan{
+          .startupMilliseconds = startupMilliseconds(options_.journal, current_), .report = report}));
+    return told;
   }
   static bool tell(const std::string& problem) {
     std::fprintf(stderr, "%s: %s\n", kName, escapedText(problem).c_str());

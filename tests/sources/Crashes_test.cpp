@@ -98,8 +98,11 @@ TEST_F(CrashesSource, ReportsTheFieldsThatItsEventsFileNames) {
   ASSERT_TRUE(finding);
   summary.add(finding->type, finding->fields, 1);
   summary.addUnread(1);
-  for (const auto& event : summary.events(1))
+  for (const auto& event : summary.events(1)) {
     EXPECT_EQ(fieldsOf(event.payload), declaredFields("crashes", event.category, event.type)) << event.type;
+    EXPECT_EQ(misdeclaredFields("crashes", event.category, event.type, event.payload), FieldNames())
+        << event.type;
+  }
 }
 
 }  // namespace

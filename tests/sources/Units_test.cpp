@@ -95,8 +95,11 @@ TEST_F(UnitsSource, ReportsTheFieldsThatItsEventsFileNames) {
   summary.addUnread(1);
   const auto events = summary.events(1);
   ASSERT_EQ(events.size(), 3U);
-  for (const auto& event : events)
+  for (const auto& event : events) {
     EXPECT_EQ(fieldsOf(event.payload), declaredFields("units", event.category, event.type)) << event.type;
+    EXPECT_EQ(misdeclaredFields("units", event.category, event.type, event.payload), FieldNames())
+        << event.type;
+  }
 }
 
 }  // namespace

@@ -32,7 +32,7 @@ TEST_F(KytctlEvents, CheckExitsWithZeroWithoutFindings) {
       folder_.write("events.toml", eventText("login", 10, 1, fieldText("email", "string", true)));
   const ProgramRun checked = run({"check", file, bag_});
   EXPECT_EQ(checked.status, 0);
-  EXPECT_EQ(checked.text, file + ": nothing found in 1 events with 1 fields\n");
+  EXPECT_EQ(checked.text, file + ": nothing found; events: 1, fields: 1\n");
 }
 
 TEST_F(KytctlEvents, CheckPrintsFindingsWithFileAndLineAndExitsWithOne) {

@@ -142,7 +142,7 @@ TEST_F(ManualExamplesOnAStage, OfWhatAProgramReportsRun) {
     ASSERT_FALSE(tools::writeFile(stage_->folder() + "/" + name, text, 0644));
   const ProgramRun check = shell(exampleOf("kytreporting-events.toml.5", "sh check"));
   EXPECT_EQ(check.status, 0) << check.text;
-  EXPECT_EQ(check.text, "events.toml: nothing found in 1 events with 3 fields\n");
+  EXPECT_EQ(check.text, "events.toml: nothing found; events: 1, fields: 3\n");
 }
 
 TEST_F(ManualExamplesOnAStage, OfTheFeedRuns) {

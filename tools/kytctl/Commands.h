@@ -110,7 +110,7 @@ struct EventsOptions {
 
 struct GenerateOptions {
   std::string file;          // events.toml
-  std::string language;      // "c", "c++", "python"
+  std::string language;      // "c", "c++", "python"; of a page: none
   std::string output = "-";  // "-": standard output
 };
 
@@ -171,6 +171,8 @@ struct SimulateOptions {
 [[nodiscard]] int checkEventsCommand(const EventsOptions& options);
 // Writes source code that fills and sends these events.
 [[nodiscard]] int generateEventsCommand(const GenerateOptions& options);
+// Writes a page about them for people.
+[[nodiscard]] int documentEventsCommand(const GenerateOptions& options);
 
 // Tells how many sessions and events of many devices leave by that bag.
 [[nodiscard]] int simulateCommand(const std::string& root, const SimulateOptions& options);

@@ -5,6 +5,7 @@
 
 #include "platform/base/TextEscape.h"
 #include "tools/StorebagFile.h"
+#include "tools/events/Document.h"
 #include "tools/events/EventsCheck.h"
 #include "tools/events/EventsFile.h"
 #include "tools/events/Generate.h"
@@ -37,7 +38,7 @@ void print(const EventsFile& file, const EventsVerdict& verdict) {
   if (verdict.further != 0)
     std::printf("%s: and %zu more\n", escapedText(file.name).c_str(), verdict.further);
   if (verdict.findings.empty())
-    std::printf("%s: nothing found in %zu events with %zu fields\n", escapedText(file.name).c_str(),
+    std::printf("%s: nothing found; events: %zu, fields: %zu\n", escapedText(file.name).c_str(),
                 file.events.size(), numberOfFields(file));
 }
 
@@ -107,6 +108,15 @@ int generateEventsCommand(const GenerateOptions& options) {
     if (event.category == 0)
       return failed(tomlError(options.file, event.line, "category 0 is the daemon's own").text);
   return write(generateEvents(file, languageNamed(options.language)), options.output);
+}
+
+int documentEventsCommand(const GenerateOptions& options) {
+  const auto read = readEvents(options.file);
+  if (const auto* problems = std::get_if<EventsProblems>(&read)) {
+    tell(*problems);
+    return 1;
+  }
+  return write(documentEvents(std::get<EventsFile>(read)), options.output);
 }
 
 }  // namespace kyt::tools

@@ -311,6 +311,11 @@ void addEvents(const Command& program, Arguments& a) {
   generate.option("--lang", a.generate.language, "The language").required().oneOf({"c", "c++", "python"});
   generate.option("-o,--output", a.generate.output, "Where it goes; without it, and with -, standard output");
   generate.runs([&a] { a.status = generateEventsCommand(a.generate); });
+  const Command document =
+      events.command("document", "Write a page about them for owners and reviewers, in Markdown");
+  document.option("file", a.generate.file, "What the program reports, events.toml").required();
+  document.option("-o,--output", a.generate.output, "Where it goes; without it, and with -, standard output");
+  document.runs([&a] { a.status = documentEventsCommand(a.generate); });
 }
 
 void addWindow(const Command& program, Arguments& a) {

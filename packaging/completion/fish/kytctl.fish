@@ -106,7 +106,7 @@ complete -c kytctl -n '__kytctl_at owner' -a 'show export erase'
 complete -c kytctl -n '__kytctl_at -b owner show' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at entitlements' -a check
 complete -c kytctl -n '__kytctl_at keys' -a make
-complete -c kytctl -n '__kytctl_at events' -a 'check generate'
+complete -c kytctl -n '__kytctl_at events' -a 'check generate document'
 complete -c kytctl -n '__kytctl_at storebag' -a 'sign verify show simulate publish diff probe'
 
 complete -c kytctl -n '__kytctl_at -b listen' -l socket -r -F -d 'Where to listen'
@@ -173,6 +173,8 @@ complete -c kytctl -n '__kytctl_due 1 "storebag sign" "storebag verify" "storeba
 complete -c kytctl -n '__kytctl_due 2 "storebag diff"' -F
 complete -c kytctl -n '__kytctl_at -b events check' -l json -d 'Print JSON'
 complete -c kytctl -n '__kytctl_at -b events generate' -l lang -x -a 'c c++ python' -d 'The language'
-complete -c kytctl -n '__kytctl_at -b events generate' -s o -l output -r -F -d 'Where it goes'
-complete -c kytctl -n '__kytctl_due 1 "events check" "events generate"' -F
+for command in generate document
+    complete -c kytctl -n "__kytctl_at -b events $command" -s o -l output -r -F -d 'Where it goes'
+end
+complete -c kytctl -n '__kytctl_due 1 "events check" "events generate" "events document"' -F
 complete -c kytctl -n '__kytctl_due 2 "events check"' -F
