@@ -1,0 +1,2 @@
+go build -o hello "$EXAMPLES/go/report.go"
+kytdemo --stage -- ./hello

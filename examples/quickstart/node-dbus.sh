@@ -1,0 +1,1 @@
+kytdemo --stage -- node "$EXAMPLES/node/report_dbus.js"
