@@ -9,6 +9,11 @@ namespace {
 
 using kyt::Value;
 
+static_assert(static_cast<int>(Value::Kind::null) == KYT_KIND_NULL);
+static_assert(static_cast<int>(Value::Kind::unsignedInteger) == KYT_KIND_UINT);
+static_assert(static_cast<int>(Value::Kind::date) == KYT_KIND_DATE);
+static_assert(static_cast<int>(Value::Kind::dictionary) == KYT_KIND_DICTIONARY);
+
 void set(kyt_dictionary* dictionary, const char* key, Value value) {
   if (dictionary != nullptr && key != nullptr) dictionary->value.set(kyt::String(key), std::move(value));
 }
@@ -19,6 +24,21 @@ const Value* find(const kyt_dictionary* dictionary, const char* key) {
 
 void append(kyt_array* array, Value value) {
   if (array != nullptr) array->value.append(std::move(value));
+}
+
+// A kyt_value is a Value in a dictionary or an array, known to C by name alone.
+const Value* valueOf(const kyt_value* value) {
+  return reinterpret_cast<const Value*>(value);
+}
+const kyt_value* inC(const Value* value) {
+  return reinterpret_cast<const kyt_value*>(value);
+}
+
+const kyt_value* entry(const kyt::Dictionary* dictionary, size_t index, const char** key) {
+  const bool exists = dictionary != nullptr && index < dictionary->size();
+  const kyt::DictionaryEntry* found = exists ? dictionary->begin() + index : nullptr;
+  if (key != nullptr) *key = found != nullptr ? found->key.c_str() : nullptr;
+  return found != nullptr ? inC(&found->value) : nullptr;
 }
 
 }  // namespace
@@ -114,6 +134,47 @@ int64_t kyt_dictionary_get_int(const kyt_dictionary* dictionary, const char* key
 double kyt_dictionary_get_double(const kyt_dictionary* dictionary, const char* key, double otherwise) {
   const Value* value = find(dictionary, key);
   return value != nullptr ? value->doubleValue() : otherwise;
+}
+
+const kyt_value* kyt_dictionary_at(const kyt_dictionary* dictionary, size_t index, const char** key) {
+  return entry(dictionary != nullptr ? &dictionary->value : nullptr, index, key);
+}
+kyt_kind kyt_value_kind(const kyt_value* value) {
+  return value != nullptr ? static_cast<kyt_kind>(valueOf(value)->kind()) : KYT_KIND_NULL;
+}
+int64_t kyt_value_int(const kyt_value* value) {
+  return value != nullptr ? valueOf(value)->longLongValue() : 0;
+}
+uint64_t kyt_value_uint(const kyt_value* value) {
+  return value != nullptr ? valueOf(value)->unsignedLongLongValue() : 0;
+}
+double kyt_value_double(const kyt_value* value) {
+  if (value == nullptr) return 0;
+  const auto date = valueOf(value)->date();
+  return date ? date->secondsSince1970 : valueOf(value)->doubleValue();
+}
+const char* kyt_value_bytes(const kyt_value* value, size_t* length) {
+  std::string_view bytes;
+  if (value != nullptr && valueOf(value)->isString()) bytes = valueOf(value)->string()->view();
+  if (const kyt::Data* data = value != nullptr ? valueOf(value)->data() : nullptr) {
+    bytes = data->view();
+    if (bytes.data() == nullptr) bytes = "";  // empty data is no null
+  }
+  if (length != nullptr) *length = bytes.size();
+  return bytes.data();
+}
+size_t kyt_value_count(const kyt_value* value) {
+  if (value == nullptr) return 0;
+  if (const kyt::Dictionary* dictionary = valueOf(value)->dictionary()) return dictionary->size();
+  const kyt::Array* array = valueOf(value)->array();
+  return array != nullptr ? array->size() : 0;
+}
+const kyt_value* kyt_value_at(const kyt_value* value, size_t index, const char** key) {
+  const kyt::Dictionary* dictionary = value != nullptr ? valueOf(value)->dictionary() : nullptr;
+  if (dictionary != nullptr) return entry(dictionary, index, key);
+  if (key != nullptr) *key = nullptr;
+  const kyt::Array* array = value != nullptr ? valueOf(value)->array() : nullptr;
+  return array != nullptr && index < array->size() ? inC(array->begin() + index) : nullptr;
 }
 
 }  // extern "C"

@@ -2,6 +2,7 @@
 #include "kytreporting/kytreporting.h"
 
 #include <algorithm>
+#include <cstddef>
 #include <cstring>
 #include <string>
 #include <string_view>
@@ -46,6 +47,17 @@ kyt_statistics inC(const KYTReporting::Statistics& figures) {
           figures.lostInQueue,
           figures.droppedUnsendable,
           figures.droppedTooLate};
+}
+
+// What kyt_statistics held when programs did not say its size: never more is written for them.
+constexpr size_t kFirstFigures = 14 * sizeof(uint64_t);
+static_assert(offsetof(kyt_statistics, dropped_too_late) + sizeof(uint64_t) == kFirstFigures);
+
+void copyFigures(const KYTReporting::Statistics& figures, kyt_statistics* out, size_t size) {
+  if (out == nullptr) return;
+  const kyt_statistics known = inC(figures);
+  std::memset(out, 0, size);
+  std::memcpy(out, &known, std::min(size, sizeof known));
 }
 
 // What the caller's library knew; the rest is 0.
@@ -281,11 +293,18 @@ void kyt_session_set_digest_key(kyt_session* session, const void* bytes, size_t 
     session->reporting->setDigestKey(kyt::Data(std::string_view(static_cast<const char*>(bytes), length)),
                                      algorithm);
 }
+void kyt_session_read_statistics(const kyt_session* session, kyt_statistics* statistics, size_t size) {
+  copyFigures(session != nullptr ? session->reporting->statistics() : KYTReporting::Statistics(), statistics,
+              size);
+}
+void kyt_total_read_statistics(kyt_statistics* statistics, size_t size) {
+  copyFigures(KYTReporting::totalStatistics(), statistics, size);
+}
 void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics) {
-  if (session != nullptr && statistics != nullptr) *statistics = inC(session->reporting->statistics());
+  if (session != nullptr) kyt_session_read_statistics(session, statistics, kFirstFigures);
 }
 void kyt_total_statistics(kyt_statistics* statistics) {
-  if (statistics != nullptr) *statistics = inC(KYTReporting::totalStatistics());
+  kyt_total_read_statistics(statistics, kFirstFigures);
 }
 void kyt_send_single_message(const kyt_options* options, uint32_t category, uint32_t type,
                              const kyt_dictionary* payload, kyt_text_callback callback, void* context) {

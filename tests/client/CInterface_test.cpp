@@ -1,8 +1,13 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <array>
 #include <atomic>
+#include <cstddef>
+#include <cstring>
 #include <future>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "kytreporting/kytreporting.h"
@@ -183,6 +188,80 @@ TEST(CInterface, ReadsBackWhatWasSetInADictionary) {
   kyt_dictionary_free(dictionary);
 }
 
+std::string textOf(const kyt_value* value) {
+  size_t length = 0;
+  const char* bytes = kyt_value_bytes(value, &length);
+  return bytes != nullptr ? std::string(bytes, length) : "none";
+}
+
+TEST(CInterface, ReadsAnyDictionaryEntryByEntry) {
+  kyt_array* array = kyt_array_new();
+  kyt_array_append_string(array, "first");
+  kyt_array_append_data(array, "", 0);
+  kyt_dictionary* dictionary = kyt_dictionary_new();
+  kyt_dictionary_set_string(dictionary, "s", "a text longer than sixteen bytes");
+  kyt_dictionary_set_int(dictionary, "i", INT64_MIN);
+  kyt_dictionary_set_uint(dictionary, "u", UINT64_MAX);
+  kyt_dictionary_set_bool(dictionary, "b", 1);
+  kyt_dictionary_set_double(dictionary, "r", 0.5);
+  kyt_dictionary_set_date(dictionary, "t", 1.5);
+  kyt_dictionary_set_data(dictionary, "d", "x\0y", 3);
+  kyt_dictionary_set_array(dictionary, "a", array);
+  kyt_dictionary_set_dictionary(dictionary, "n", dictionary);
+  kyt_array_free(array);
+
+  std::string keys;
+  std::vector<int> kinds;
+  std::vector<const kyt_value*> values;
+  const char* key = nullptr;
+  for (size_t i = 0; i < kyt_dictionary_count(dictionary); ++i) {
+    values.push_back(kyt_dictionary_at(dictionary, i, &key));
+    keys += key;
+    kinds.push_back(kyt_value_kind(values.back()));
+  }
+  EXPECT_EQ(keys, "siubrtdan");
+  EXPECT_EQ(kinds,
+            (std::vector<int>{KYT_KIND_STRING, KYT_KIND_INT, KYT_KIND_UINT, KYT_KIND_BOOL, KYT_KIND_DOUBLE,
+                              KYT_KIND_DATE, KYT_KIND_DATA, KYT_KIND_ARRAY, KYT_KIND_DICTIONARY}));
+  EXPECT_EQ(textOf(values[0]), "a text longer than sixteen bytes");
+  EXPECT_EQ(kyt_value_int(values[1]), INT64_MIN);
+  EXPECT_EQ(kyt_value_uint(values[2]), UINT64_MAX);
+  EXPECT_EQ(kyt_value_int(values[3]), 1);
+  EXPECT_EQ(kyt_value_double(values[4]), 0.5);
+  EXPECT_EQ(kyt_value_double(values[5]), 1.5);
+  EXPECT_EQ(textOf(values[6]), std::string("x\0y", 3));
+  ASSERT_EQ(kyt_value_count(values[7]), 2U);
+  EXPECT_EQ(textOf(kyt_value_at(values[7], 0, &key)), "first");
+  EXPECT_EQ(key, nullptr);
+  EXPECT_EQ(textOf(kyt_value_at(values[7], 1, nullptr)), "");
+  ASSERT_EQ(kyt_value_count(values[8]), 8U);
+  EXPECT_EQ(kyt_value_int(kyt_value_at(values[8], 3, &key)), 1);
+  EXPECT_STREQ(key, "b");
+  kyt_dictionary_free(dictionary);
+}
+
+TEST(CInterface, ReadsNothingWhereNothingIs) {
+  kyt_dictionary* dictionary = kyt_dictionary_new();
+  kyt_dictionary_set_int(dictionary, "i", 5);
+  const char* key = "";
+  for (const kyt_dictionary* none : std::vector<const kyt_dictionary*>{nullptr, dictionary}) {
+    EXPECT_EQ(kyt_dictionary_at(none, 1, &key), nullptr);
+    EXPECT_EQ(std::exchange(key, ""), nullptr);
+  }
+  for (const kyt_value* value :
+       {static_cast<const kyt_value*>(nullptr), kyt_dictionary_at(dictionary, 0, nullptr)}) {
+    EXPECT_EQ(textOf(value), "none");
+    EXPECT_EQ(kyt_value_count(value), 0U);
+    EXPECT_EQ(kyt_value_at(value, 0, &key), nullptr);
+    EXPECT_EQ(std::exchange(key, ""), nullptr);
+  }
+  EXPECT_EQ(kyt_value_kind(nullptr), KYT_KIND_NULL);
+  EXPECT_EQ(kyt_value_int(nullptr), 0);
+  EXPECT_EQ(kyt_value_uint(nullptr), 0U);
+  EXPECT_EQ(kyt_value_double(nullptr), 0);
+  kyt_dictionary_free(dictionary);
+}
+
 TEST(CInterface, SendsArraysWithValuesOfEachKind) {
   TemporaryFolder folder;
   const std::string socket = folder / "socket";
@@ -325,6 +404,59 @@ TEST(CInterface, NamesTheKeyThatIsWrongInASessionsInformation) {
       },
       &configured);
   EXPECT_NE(answerOf(configured).find("RequireUserinfo"), std::string::npos);
+  kyt_session_close(session);
+}
+
+// Figures as an older or a newer library knows them, with a guard behind.
+struct GuardedFigures {
+  kyt_statistics figures;
+  uint64_t later[2];
+  uint64_t guard;
+};
+
+TEST(CInterface, WritesTheFiguresThatTheProgramsLibraryKnowsAndNothingBehind) {
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = "/nonexistent";
+  kyt_session* session = kyt_session_open(&options);
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 1);
+
+  GuardedFigures newer{};
+  std::memset(&newer, 0xFF, sizeof newer);
+  kyt_session_read_statistics(session, &newer.figures, offsetof(GuardedFigures, guard));
+  EXPECT_EQ(newer.figures.accepted, 3U);
+  EXPECT_EQ(newer.later[0] + newer.later[1], 0U) << "figures that the library does not have are 0";
+  EXPECT_EQ(newer.guard, UINT64_MAX);
+
+  GuardedFigures older{};
+  std::memset(&older, 0xFF, sizeof older);
+  kyt_session_read_statistics(session, &older.figures, offsetof(kyt_statistics, accepted));
+  EXPECT_EQ(older.figures.sent, 0U);
+  EXPECT_EQ(older.figures.accepted, UINT64_MAX) << "behind the size that was given";
+  kyt_total_read_statistics(&older.figures, offsetof(kyt_statistics, lost_in_queue));
+  EXPECT_GE(older.figures.accepted, 3U);
+  EXPECT_EQ(older.figures.lost_in_queue, UINT64_MAX);
+  kyt_session_read_statistics(nullptr, &older.figures, sizeof older.figures);
+  EXPECT_EQ(older.figures.accepted, 0U);
+  kyt_session_read_statistics(session, nullptr, sizeof older.figures);
+  kyt_session_close(session);
+}
+
+// Programs that were built before a size was given have room for these, whatever comes later.
+TEST(CInterface, WritesFourteenFiguresWhereNoSizeIsGiven) {
+  kyt_options options{};
+  options.size = sizeof options;
+  options.socket_path = "/nonexistent";
+  kyt_session* session = kyt_session_open(&options);
+  EXPECT_EQ(kyt_session_send(session, 1, 1, nullptr, 0), 1);
+  std::array<uint64_t, sizeof(kyt_statistics) / sizeof(uint64_t) + 16> room{};
+  for (const bool total : {false, true}) {
+    room.fill(UINT64_MAX);
+    auto* figures = reinterpret_cast<kyt_statistics*>(room.data());
+    total ? kyt_total_statistics(figures) : kyt_session_statistics(session, figures);
+    EXPECT_EQ(std::count(room.begin(), room.begin() + 14, UINT64_MAX), 0);
+    EXPECT_EQ(std::count(room.begin() + 14, room.end(), UINT64_MAX), static_cast<long>(room.size() - 14));
+  }
   kyt_session_close(session);
 }
 

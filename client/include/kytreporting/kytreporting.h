@@ -74,6 +74,38 @@ KYT_API void kyt_array_append_dictionary(kyt_array* array, const kyt_dictionary*
 KYT_API void kyt_array_append_array(kyt_array* array, const kyt_array* value);
 KYT_API size_t kyt_array_count(const kyt_array* array);
 
+/* Reading what a callback was given, entry by entry, whatever its keys are. A value belongs to its dictionary and is valid
+ * until that changes or, in a callback, until the callback returns. */
+typedef struct kyt_value kyt_value;
+typedef enum kyt_kind {
+  KYT_KIND_NULL = 0,
+  KYT_KIND_BOOL = 1,
+  KYT_KIND_INT = 2,
+  KYT_KIND_UINT = 3,
+  KYT_KIND_DOUBLE = 4,
+  KYT_KIND_DATE = 5,
+  KYT_KIND_STRING = 6,
+  KYT_KIND_DATA = 7,
+  KYT_KIND_ARRAY = 8,
+  KYT_KIND_DICTIONARY = 9
+} kyt_kind;
+/* The entry of that place in the dictionary's order, the first being 0, and its key, where `key` is not null; null, and a
+ * null key, from kyt_dictionary_count on. */
+KYT_API const kyt_value* kyt_dictionary_at(const kyt_dictionary* dictionary, size_t index, const char** key);
+/* KYT_KIND_NULL for null. */
+KYT_API kyt_kind kyt_value_kind(const kyt_value* value);
+/* The reading of a boolean, number or text; 0 for others. */
+KYT_API int64_t kyt_value_int(const kyt_value* value);
+KYT_API uint64_t kyt_value_uint(const kyt_value* value);
+/* Of a date, the seconds since 1970. */
+KYT_API double kyt_value_double(const kyt_value* value);
+/* A text, NUL-terminated, or data, and how many bytes it has, where `length` is not null; null and 0 for others. */
+KYT_API const char* kyt_value_bytes(const kyt_value* value, size_t* length);
+/* Of an array or a dictionary; 0 for others. */
+KYT_API size_t kyt_value_count(const kyt_value* value);
+/* As kyt_dictionary_at; the key is null in an array. */
+KYT_API const kyt_value* kyt_value_at(const kyt_value* value, size_t index, const char** key);
+
 /* What is wrong, as a number. */
 typedef enum kyt_error {
   KYT_ERROR_NONE = 0,
@@ -198,7 +230,8 @@ KYT_API void kyt_session_upload_log_data(kyt_session* session, const kyt_array* 
 
 /* Where a session's messages are, and what else happened to it. Always, unless something is in motion:
  *   accepted = sent + queued + lost_on_connection_end + lost_in_queue + dropped_unsendable + dropped_too_late
- * and what was refused (dropped_queue_full, dropped_closed, dropped_invalid) was not accepted. */
+ * and what was refused (dropped_queue_full, dropped_closed, dropped_invalid) was not accepted. A later library may have
+ * more figures, at the end. */
 typedef struct kyt_statistics {
   uint64_t sent;               /* written to the daemon's socket, and not lost with their connection */
   uint64_t dropped_queue_full; /* refused: the queue was full */
@@ -219,9 +252,15 @@ typedef struct kyt_statistics {
   uint64_t dropped_unsendable; /* larger than a megabyte, or nested too deeply */
   uint64_t dropped_too_late;   /* no daemon took them within the call deadline */
 } kyt_statistics;
+/* `size` is sizeof(kyt_statistics): how the library knows which figures exist. It writes those, 0 for figures that it does
+ * not have, and nothing behind them. A null session has zeros. */
+KYT_API void kyt_session_read_statistics(const kyt_session* session, kyt_statistics* statistics, size_t size);
+/* The same: the sums over all sessions of this process, ended ones and single messages included. In a child made by fork()
+ * they begin at zero, and the parent's sessions do not count. */
+KYT_API void kyt_total_read_statistics(kyt_statistics* statistics, size_t size);
+/* The first fourteen figures, those above, in every library of this name: whoever wants later ones calls the functions that
+ * take a size. For a null session nothing is written. */
 KYT_API void kyt_session_statistics(const kyt_session* session, kyt_statistics* statistics);
-/* The sums over all sessions of this process, ended ones and single messages included. In a child made by fork() they
- * begin at zero, and the parent's sessions do not count. */
 KYT_API void kyt_total_statistics(kyt_statistics* statistics);
 
 /* One event without a session of its own; the callback gets "finished", or what went wrong: null options too. */
