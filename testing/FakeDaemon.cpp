@@ -20,6 +20,7 @@
 #include "platform/objects/Keys.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/WorkerPool.h"
+#include "testing/Aggregators.h"
 #include "testing/FakeSession.h"
 #include "testing/Records.h"
 
@@ -61,7 +62,8 @@ class FakeDaemon::Implementation final : private ListenerDelegate, private Entit
         states_(statesOf(options)),
         folder_(options.socketPath.empty() ? makeFolder() : std::string()),
         path_(options.socketPath.empty() ? folder_ + "/socket" : options.socketPath),
-        records_(std::make_shared<Records>(std::move(options.onEvent), options.dieAfter)) {}
+        records_(std::make_shared<Records>(std::move(options.onEvent), options.dieAfter)),
+        aggregators_(std::make_shared<Aggregators>()) {}
   ~Implementation() override {
     stop();
     std::error_code ignored;
@@ -88,7 +90,8 @@ class FakeDaemon::Implementation final : private ListenerDelegate, private Entit
   const std::optional<Array> states_;
   const std::string folder_, path_;
   const Limits limits_;
-  const std::shared_ptr<Records> records_;  // with the sessions of the connections
+  const std::shared_ptr<Records> records_;          // with the sessions of the connections
+  const std::shared_ptr<Aggregators> aggregators_;  // likewise
 
   // Any thread.
   UserBudget budget_{UserShares::of(limits_, kMostBytesOfAUser, kMostDescriptors)};
@@ -164,6 +167,7 @@ void FakeDaemon::Implementation::takeDown() {
 void FakeDaemon::Implementation::noteEnd(uint64_t number) {
   Event event;
   event.connection = number;
+  aggregators_->remove(number);
   records_->add(std::move(event));
   MutexLock lock(open_);
   --opened_;
@@ -174,7 +178,8 @@ bool FakeDaemon::Implementation::listenerShouldAcceptNewConnection(
     Listener& /*listener*/, const std::shared_ptr<Connection>& connection) {
   if (!records_->isAlive() || !connection->entitlementValue(kEntitlement).boolValue()) return false;
   const uint64_t number = ++connections_;
-  connection->setExportedObject(std::make_shared<FakeSession>(number, records_, states_));
+  connection->setExportedObject(
+      std::make_shared<FakeSession>(number, connection, records_, aggregators_, states_));
   connection->setInvalidationHandler([this, number] { noteEnd(number); });
   {
     MutexLock lock(open_);

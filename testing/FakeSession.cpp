@@ -20,6 +20,7 @@ void FakeSession::setSessionInfo(Dictionary info, std::optional<Dictionary> user
   made.sessionInfo = std::move(info);
   made.userInfo = std::move(user);
   made.aggregates = aggregates;
+  aggregators_->add(made, connection_);
   note(std::move(made));
 }
 
@@ -48,7 +49,8 @@ void FakeSession::sendMessageWithDictionary(Dictionary message, ObjectReply repl
   if (const Dictionary* payload = message.dictionary(kKYTReportingMessageParametersPayload))
     made.payload = *payload;
   pending_ = true;
-  const bool noted = note(std::move(made));
+  const bool noted = note(made);
+  if (noted) aggregators_->offer(made);
   if (!reply) return;
   if (!noted || !records_->isAlive()) return keep(std::move(reply));
   reply(Value());

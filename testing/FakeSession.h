@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/ipc/ClientSessionInterface.h"
+#include "testing/Aggregators.h"
 #include "testing/Records.h"
 
 namespace kyt::testing {
@@ -14,8 +15,13 @@ namespace kyt::testing {
 class FakeSession final : public ClientSessionInterface {
  public:
   // What configurations bring: names of back ends, or none.
-  FakeSession(uint64_t number, std::shared_ptr<Records> records, std::optional<Array> states)
-      : number_(number), records_(std::move(records)), states_(std::move(states)) {}
+  FakeSession(uint64_t number, std::weak_ptr<Connection> connection, std::shared_ptr<Records> records,
+              std::shared_ptr<Aggregators> aggregators, std::optional<Array> states)
+      : number_(number),
+        connection_(std::move(connection)),
+        records_(std::move(records)),
+        aggregators_(std::move(aggregators)),
+        states_(std::move(states)) {}
 
   void setSessionInfo(Dictionary info, std::optional<Dictionary> user, Value frameworks,
                       bool aggregates) override;
@@ -46,7 +52,9 @@ class FakeSession final : public ClientSessionInterface {
   }
 
   const uint64_t number_;
-  const std::shared_ptr<Records> records_;  // with the other connections, and the daemon
+  const std::weak_ptr<Connection> connection_;      // which holds this
+  const std::shared_ptr<Records> records_;          // with the other connections, and the daemon
+  const std::shared_ptr<Aggregators> aggregators_;  // likewise
   const std::optional<Array> states_;
   bool pending_ = false;  // messages came since the last flush
 };

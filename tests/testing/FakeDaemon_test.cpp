@@ -5,6 +5,7 @@
 #include <future>
 
 #include "kytreporting/KYTReporting.h"
+#include "platform/base/Mutex.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -139,6 +140,45 @@ TEST(FakeDaemonOfTests, TellsEachEventAsItComes) {
   const auto session = sessionOn(daemon);
   session->sendMessage(1, 7, {});
   EXPECT_EQ(told.get_future().get(), 7);
+}
+
+TEST(FakeDaemonOfTests, GivesMessagesToTheTopMostSessionThatAggregates) {
+  FakeDaemon daemon;
+  ASSERT_EQ(daemon.start(), std::nullopt);
+  Mutex mutex;
+  std::vector<std::string> received;  // guarded by it
+  const auto open = [&](const char* token, uint32_t level, bool aggregates) {
+    KYTReporting::Options options;
+    options.socketPath = daemon.socketPath();
+    options.sessionInfo = Dictionary{{"SessionID", level},
+                                     {"HierarchyToken", Dictionary{{"TokenID", token}, {"Level", level}}}};
+    if (aggregates)
+      options.aggregationBlock = [&, level](const AggregatedMessage& message) {
+        MutexLock lock(mutex);
+        received.push_back(std::to_string(level) + " of " +
+                           std::to_string(message.sessionInfo->unsignedInteger("SessionID")) + ": " +
+                           std::to_string(message.category) + " " + description(*message.payload));
+      };
+    return KYTReporting::open(std::move(options));
+  };
+  const auto top = open("a", 1, true), middle = open("a", 2, true), lowest = open("a", 3, false),
+             above = open("a", 0, false), stranger = open("b", 4, false);
+  ASSERT_TRUE(daemon.waitFor(Kind::session, 5));
+  uint32_t category = 0;
+  size_t expected = 0;
+  for (const auto& session : {&above, &stranger, &lowest, &middle, &top}) {
+    ++category;
+    EXPECT_TRUE((*session)->sendMessage(category, 1, {{"k", category}}));
+    ASSERT_TRUE(daemon.waitFor(Kind::message, category));
+    if (session == &lowest || session == &middle || session == &top) ++expected;
+    ASSERT_TRUE(eventually([&] {
+      MutexLock lock(mutex);
+      return received.size() == expected;
+    }));
+  }
+  MutexLock lock(mutex);
+  EXPECT_EQ(received,
+            (std::vector<std::string>{"1 of 3: 3 {\"k\":3}", "1 of 2: 4 {\"k\":4}", "1 of 1: 5 {\"k\":5}"}));
 }
 
 TEST(FakeDaemonOfTests, SaysWhyItCannotListen) {

@@ -1,5 +1,7 @@
 // libkytreporting-testing: a daemon in the test of a program that reports. It listens on a socket of its own, speaks what
-// the real one speaks, and keeps what it was told: no entitlement, no storebag, no network. Nothing leaves it.
+// the real one speaks, and keeps what it was told: no entitlement, no storebag, no network. Nothing leaves it. A session
+// that aggregates gets its own messages and those of the sessions beneath it in its hierarchy, as from the real one, but no
+// starts and ends of sessions.
 //
 //   kyt::testing::FakeDaemon daemon;                      // or with Options
 //   ASSERT_EQ(daemon.start(), std::nullopt);
