@@ -21,19 +21,21 @@ class PythonService : public StageTest {
     putBag("cadmor", {entry("service")});
     startDaemon();
   }
-  [[nodiscard]] std::optional<tools::ChildProcess> startService() const {
+  [[nodiscard]] std::optional<tools::ChildProcess> start(const std::string& program,
+                                                         const std::string& argument) const {
     tools::ChildProcess::Options how;
     how.outputFile = stage_->folder() + "/service.log";
     return tools::ChildProcess::start(
         "env",
         {"PYTHONPATH=" KYT_PYTHON, "PYTHONDONTWRITEBYTECODE=1", "LD_LIBRARY_PATH=" KYT_LIBRARIES,
-         "KYTREPORTING_SOCKET=" + socket(), "/usr/bin/python3", KYT_PYTHON "/tests/service.py", "20"},
+         "KYTREPORTING_SOCKET=" + socket(), "/usr/bin/python3", KYT_PYTHON "/tests/" + program, argument},
         how);
   }
+  [[nodiscard]] std::string said() const { return contents(stage_->folder() + "/service.log"); }
   // The sums over the lines that its processes printed.
   [[nodiscard]] Dictionary figures(long& processes) const {
     Dictionary sums;
-    std::istringstream lines(contents(stage_->folder() + "/service.log"));
+    std::istringstream lines(said());
     RapidJSON json;
     for (std::string line; std::getline(lines, line); ++processes) {
       auto parsed = json.parse(line);
@@ -51,17 +53,16 @@ class PythonService : public StageTest {
 };
 
 TEST_F(PythonService, ClosesItsBooksUnderFiftyRestartsOfTheDaemonAndTwentyForks) {
-  auto service = startService();
+  auto service = start("service.py", "20");
   ASSERT_TRUE(service);
-  ASSERT_TRUE(arrive("client=service&method=0", 1)) << contents(stage_->folder() + "/service.log");
+  ASSERT_TRUE(arrive("client=service&method=0", 1)) << said();
   for (int restart = 0; restart < 50; ++restart) {
     ASSERT_EQ(stage_->stopDaemon(std::chrono::seconds(30)).value_or(-1), 0) << daemonLog();
     startDaemon();
     ASSERT_TRUE(service->isRunning());
   }
   service->signal(SIGTERM);
-  ASSERT_EQ(service->wait(std::chrono::seconds(120)).value_or(-1), 0)
-      << contents(stage_->folder() + "/service.log");
+  ASSERT_EQ(service->wait(std::chrono::seconds(120)).value_or(-1), 0) << said();
 
   long processes = 0;
   const Dictionary sums = figures(processes);
@@ -79,6 +80,32 @@ TEST_F(PythonService, ClosesItsBooksUnderFiftyRestartsOfTheDaemonAndTwentyForks)
   // a storebag has no back end for what it took.
   EXPECT_TRUE(arrive("client=service&method=10", 1)) << daemonLog();
   EXPECT_LE(arrived("client=service&method=10"), sum("sent") + sum("lost_on_connection_end"));
+}
+
+size_t countOf(const std::string& text, const std::string& part) {
+  size_t count = 0;
+  for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1)) ++count;
+  return count;
+}
+
+TEST_F(PythonService, AggregatesUntilTheDaemonEndsWhateverItsCallbackThrows) {
+  auto service = start("aggregator.py", "");
+  ASSERT_TRUE(service);
+  ASSERT_TRUE(eventually([&] { return countOf(said(), "{\"ready\": true}") == 1 || !service->isRunning(); }));
+  for (int number = 0; number < 3; ++number)
+    EXPECT_TRUE(eventually([&] {
+      return countOf(said(), "{\"session\": 2, \"category\": 12, \"type\": 9, \"payload\": {\"number\": " +
+                                 std::to_string(number) + ", \"text\": \"\\u00e4\"}, \"is_last\": false}") ==
+             1;
+    })) << said();
+  EXPECT_EQ(countOf(said(), "\"is_last\": true"), 0U) << said();
+  ASSERT_EQ(stage_->stopDaemon(std::chrono::seconds(30)).value_or(-1), 0) << daemonLog();
+  EXPECT_EQ(service->wait(std::chrono::seconds(60)).value_or(-1), 0) << said();
+  EXPECT_EQ(
+      countOf(said(), "{\"session\": 0, \"category\": 0, \"type\": 0, \"payload\": null, \"is_last\": true}"),
+      1U)
+      << said();
+  EXPECT_EQ(countOf(said(), "ValueError: not that one"), 3U) << said();
 }
 
 }  // namespace

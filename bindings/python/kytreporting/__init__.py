@@ -16,6 +16,7 @@ its first use. What is queued when the program ends is sent, for a second at mos
 The page "Reporting from a program" has the whole story: PROGRAMS.md in the documents of libkytreporting-dev.
 """
 
+from ._aggregation import Aggregated
 from ._errors import (
     BackEndError,
     ClosedError,
@@ -35,6 +36,7 @@ from ._values import Payload, Scalar
 __version__ = "8.0.0"
 
 __all__ = [
+    "Aggregated",
     "BackEndError",
     "ClosedError",
     "Counter",

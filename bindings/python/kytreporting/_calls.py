@@ -10,7 +10,7 @@ from __future__ import annotations
 import concurrent.futures
 import itertools
 import threading
-from typing import Any, Dict, List, Optional, TypeVar
+from typing import Any, Callable, Dict, List, Optional, TypeVar
 
 from ._errors import TimedOutError, error_of
 from ._library import STATES_CALLBACK, SUCCESS_CALLBACK, TEXT_CALLBACK, lib
@@ -20,6 +20,16 @@ T = TypeVar("T")
 _pending: Dict[int, "concurrent.futures.Future[Any]"] = {}
 _numbers = itertools.count(1)
 within = threading.local()  # .callback: this thread runs one now
+
+
+def run(function: Callable[..., object], *arguments: Any) -> None:
+    """One of the program's own callbacks."""
+    before = getattr(within, "callback", False)
+    within.callback = True
+    try:
+        function(*arguments)
+    finally:
+        within.callback = before
 
 
 def begin() -> "tuple[int, concurrent.futures.Future[Any]]":
@@ -53,15 +63,10 @@ def _complete(number: int, result: Any, error: Optional[bytes]) -> None:
     future = _pending.pop(number, None)
     if future is None:
         return
-    before = getattr(within, "callback", False)
-    within.callback = True
-    try:
-        if error is None:
-            future.set_result(result)
-        else:
-            future.set_exception(error_of(lib.kyt_callback_error(), error.decode("utf-8", "replace")))
-    finally:
-        within.callback = before
+    if error is None:
+        run(future.set_result, result)
+    else:
+        run(future.set_exception, error_of(lib.kyt_callback_error(), error.decode("utf-8", "replace")))
 
 
 def _text(text: Optional[bytes]) -> Optional[str]:

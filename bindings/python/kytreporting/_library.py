@@ -35,7 +35,7 @@ class Options(ctypes.Structure):
 
 
 class Figures(ctypes.Structure):
-    """kyt_statistics, with room behind it for what a later library counts besides."""
+    """kyt_statistics, as far as this module knows it: the library is told its size."""
 
     _fields_ = [
         ("sent", c_uint64),
@@ -52,7 +52,6 @@ class Figures(ctypes.Structure):
         ("lost_in_queue", c_uint64),
         ("dropped_unsendable", c_uint64),
         ("dropped_too_late", c_uint64),
-        ("later", c_uint64 * 50),
     ]
 
 
@@ -69,6 +68,15 @@ _FUNCTIONS = {
     "kyt_dictionary_set_data": (None, [_P, c_char_p, c_char_p, c_size_t]),
     "kyt_dictionary_set_dictionary": (None, [_P, c_char_p, _P]),
     "kyt_dictionary_set_array": (None, [_P, c_char_p, _P]),
+    "kyt_dictionary_count": (c_size_t, [_P]),
+    "kyt_dictionary_at": (_P, [_P, c_size_t, ctypes.POINTER(c_char_p)]),
+    "kyt_value_kind": (c_int, [_P]),
+    "kyt_value_int": (c_int64, [_P]),
+    "kyt_value_uint": (c_uint64, [_P]),
+    "kyt_value_double": (c_double, [_P]),
+    "kyt_value_bytes": (_P, [_P, ctypes.POINTER(c_size_t)]),
+    "kyt_value_count": (c_size_t, [_P]),
+    "kyt_value_at": (_P, [_P, c_size_t, ctypes.POINTER(c_char_p)]),
     "kyt_array_new": (_P, []),
     "kyt_array_free": (None, [_P]),
     "kyt_array_append_string": (None, [_P, c_char_p]),
@@ -100,8 +108,8 @@ _FUNCTIONS = {
     "kyt_session_set_digest_key": (None, [_P, c_char_p, c_size_t, c_int32]),
     "kyt_session_upload_file": (None, [_P, c_char_p, SUCCESS_CALLBACK, _P]),
     "kyt_session_upload_log_data": (None, [_P, _P, SUCCESS_CALLBACK, _P]),
-    "kyt_session_statistics": (None, [_P, ctypes.POINTER(Figures)]),
-    "kyt_total_statistics": (None, [ctypes.POINTER(Figures)]),
+    "kyt_session_read_statistics": (None, [_P, ctypes.POINTER(Figures), c_size_t]),
+    "kyt_total_read_statistics": (None, [ctypes.POINTER(Figures), c_size_t]),
     "kyt_send_single_message": (None, [ctypes.POINTER(Options), c_uint32, c_uint32, _P, TEXT_CALLBACK, _P]),
 }
 

@@ -19,8 +19,9 @@ from types import TracebackType
 from typing import Any, Callable, Dict, List, Mapping, Optional, Sequence, Tuple, Type, Union
 
 from . import _calls
+from ._aggregation import Aggregated, aggregated
 from ._errors import ClosedError, Error, InvalidError, error_of
-from ._library import STATE_CALLBACK, Figures, Options, lib
+from ._library import AGGREGATION_CALLBACK, STATE_CALLBACK, Figures, Options, lib
 from ._statistics import Statistics, statistics_of
 from ._timing import Counter, Timer
 from ._values import Array, Dictionary, Payload
@@ -73,19 +74,26 @@ _numbers = itertools.count(1)
 _program: Dict[str, bool] = {"ended": False}
 
 
+# The library's thread calls these two with the interpreter's lock, which ctypes takes. An exception goes to
+# sys.unraisablehook, which prints it, and the program goes on.
+
+
 def _tell_state(state: int, why: bytes, number: int) -> None:
     session = _sessions.get(number)
-    if session is None or session._told is None:
-        return
-    before = getattr(_calls.within, "callback", False)
-    _calls.within.callback = True
-    try:
-        session._told(State(state), why.decode("utf-8", "replace"))
-    finally:
-        _calls.within.callback = before
+    if session is not None and session._told is not None:
+        _calls.run(session._told, State(state), why.decode("utf-8", "replace"))
+
+
+def _tell_aggregated(
+    info: Optional[int], timestamp: float, category: int, type: int, payload: Optional[int], number: int
+) -> None:
+    session = _sessions.get(number)
+    if session is not None and session._aggregates is not None:
+        _calls.run(session._aggregates, aggregated(info, timestamp, category, type, payload))
 
 
 _on_state_change = STATE_CALLBACK(_tell_state)
+_on_aggregated = AGGREGATION_CALLBACK(_tell_aggregated)
 
 
 def _bytes_of(text: Optional[str]) -> Optional[bytes]:
@@ -121,6 +129,8 @@ class Session:
     socket: the daemon's, instead of the environment's KYTREPORTING_SOCKET or the fixed one.
     max_queued_messages, max_queued_bytes: bounds of the queue (64 to 65536; at least 4096).
     on_state_change: called as (State, reason) on the library's thread; it must not wait for answers.
+    on_aggregated: the session aggregates: called as (Aggregated) on the library's thread with each of its own messages and
+        of those beneath it in its hierarchy, where no session above does; it must not wait for answers.
     call_deadline: seconds that an answer waits for a daemon that is not there; 0: as long as the session lives.
     finish_waits_for_daemon: whether finish() waits for a daemon that was never there.
     flush_interval: seconds that an event is batched at most; 0: until something else flushes.
@@ -147,6 +157,7 @@ class Session:
         max_queued_messages: int = 0,
         max_queued_bytes: int = 0,
         on_state_change: Optional[Callable[[State, str], object]] = None,
+        on_aggregated: Optional[Callable[[Aggregated], object]] = None,
         call_deadline: float = 30.0,
         finish_waits_for_daemon: bool = False,
         flush_interval: float = 0.0,
@@ -167,6 +178,7 @@ class Session:
         self._socket = socket
         self._bounds = (max_queued_messages, max_queued_bytes)
         self._told = on_state_change
+        self._aggregates = on_aggregated
         self._deadline = call_deadline
         self._waits = finish_waits_for_daemon
         self._flush_interval = flush_interval
@@ -209,6 +221,9 @@ class Session:
         if self._told is not None:
             options.on_state_change = _on_state_change
             options.state_context = self._number
+        if self._aggregates is not None:
+            options.aggregation = _on_aggregated
+            options.aggregation_context = self._number
         with Dictionary(self._information) as information, Dictionary(self._user) as user:
             options.session_info = information.pointer
             if self._user is not None:
@@ -404,7 +419,7 @@ class Session:
         """Where the session's messages are. In a forked child they begin at zero."""
         figures = Figures()
         if self._pointer is not None or not self._ended:
-            lib.kyt_session_statistics(self._handle(), ctypes.byref(figures))
+            lib.kyt_session_read_statistics(self._handle(), ctypes.byref(figures), ctypes.sizeof(figures))
         return statistics_of(figures)
 
     # --- the end
@@ -473,7 +488,7 @@ def _message(category: int, type: int, payload: Optional[Payload], fields: Mappi
 def total_statistics() -> Statistics:
     """The sums over all sessions of this process, ended ones and single messages included."""
     figures = Figures()
-    lib.kyt_total_statistics(ctypes.byref(figures))
+    lib.kyt_total_read_statistics(ctypes.byref(figures), ctypes.sizeof(figures))
     return statistics_of(figures)
 
 

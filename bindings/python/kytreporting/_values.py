@@ -2,8 +2,9 @@
 
 from __future__ import annotations
 
+import ctypes
 import datetime
-from typing import Any, Iterable, Mapping, Optional, Sequence, Union
+from typing import Any, Dict, Iterable, Mapping, Optional, Sequence, Union
 
 from ._errors import InvalidError
 from ._library import lib
@@ -109,3 +110,63 @@ def _put(library: Any, prefix: str, where: Sequence[Any], value: Any, depth: int
             put("array", array.pointer)
     else:
         raise _unknown(value)
+
+
+# By the numbers of kyt_kind; what is not here is null.
+_BOOL, _INT, _UINT, _DOUBLE, _DATE, _STRING, _DATA, _ARRAY, _DICTIONARY = range(1, 10)
+
+
+def entries_of(dictionary: Optional[int]) -> Optional[Dict[str, Any]]:
+    """A kyt_dictionary as Python's; None for null."""
+    if not dictionary:
+        return None
+    entries: Dict[str, Any] = {}
+    key = ctypes.c_char_p()
+    for index in range(lib.kyt_dictionary_count(dictionary)):
+        value = lib.kyt_dictionary_at(dictionary, index, ctypes.byref(key))
+        entries[_key_of(key)] = _value_of(value)
+    return entries
+
+
+def _key_of(key: ctypes.c_char_p) -> str:
+    return (key.value or b"").decode("utf-8", "replace")
+
+
+def _value_of(value: int) -> Any:
+    kind = lib.kyt_value_kind(value)
+    if kind == _BOOL:
+        return bool(lib.kyt_value_int(value))
+    if kind == _INT:
+        return lib.kyt_value_int(value)
+    if kind == _UINT:
+        return lib.kyt_value_uint(value)
+    if kind == _DOUBLE:
+        return lib.kyt_value_double(value)
+    if kind == _DATE:
+        return _date_of(lib.kyt_value_double(value))
+    if kind in (_STRING, _DATA):
+        length = ctypes.c_size_t()
+        data = ctypes.string_at(lib.kyt_value_bytes(value, ctypes.byref(length)), length.value)
+        return data if kind == _DATA else data.decode("utf-8", "replace")
+    if kind in (_ARRAY, _DICTIONARY):
+        return _container_of(value, kind)
+    return None
+
+
+def _container_of(value: int, kind: int) -> Any:
+    key = ctypes.c_char_p()
+    places = range(lib.kyt_value_count(value))
+    if kind == _ARRAY:
+        return [_value_of(lib.kyt_value_at(value, index, None)) for index in places]
+    entries: Dict[str, Any] = {}
+    for index in places:
+        entry = lib.kyt_value_at(value, index, ctypes.byref(key))
+        entries[_key_of(key)] = _value_of(entry)
+    return entries
+
+
+def _date_of(seconds: float) -> Any:
+    try:
+        return datetime.datetime.fromtimestamp(seconds, datetime.timezone.utc)
+    except (OverflowError, ValueError, OSError):
+        return seconds
