@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <set>
 
 #include "sources/Journal.h"
 
@@ -67,27 +68,53 @@ std::optional<EndedBoot> timesOf(const std::string& folder, const std::string& b
   return found;
 }
 
+// The run to which a dump of that time belongs: the latest that had begun, or none. Where no time was kept the memory holds
+// but the last kernel's. `boots`: the oldest first.
+EndedBoot* runOf(std::vector<EndedBoot>& boots, uint64_t written) {
+  if (boots.empty()) return nullptr;
+  if (written == 0) return &boots.back();
+  EndedBoot* found = nullptr;
+  for (EndedBoot& boot : boots)
+    if (boot.began <= written) found = &boot;
+  return found;
+}
+
+// Runs of which a kernel left a panic behind. What systemd-pstore moved in the current run is of the last one; what it
+// moved before was told before.
+std::set<const EndedBoot*> panickedRuns(std::vector<EndedBoot>& boots, uint64_t currentBegan,
+                                        const PanicDumps& panics) {
+  std::set<const EndedBoot*> panicked;
+  for (const uint64_t written : panics.written)
+    if (const EndedBoot* boot = runOf(boots, written)) panicked.insert(boot);
+  for (const uint64_t moved : panics.moved)
+    if (currentBegan != 0 && moved >= currentBegan && !boots.empty()) panicked.insert(&boots.back());
+  return panicked;
+}
+
 }  // namespace
 
 EndedBoots endedBoots(const std::string& folder, const std::string& current, uint64_t after,
-                      bool watchdogFired) {
+                      const KeptSigns& signs) {
   EndedBoots result;
   const auto journal = openJournal(folder, {}, result.problem);
   if (!journal) return result;
+  uint64_t currentBegan = 0;
   for (const std::string& boot : journal->valuesOf("_BOOT_ID")) {
-    if (boot == current) continue;
     const auto found = timesOf(folder, boot, result.problem);
-    if (found && found->ended > after) result.boots.push_back(*found);
+    if (found && boot == current) currentBegan = found->began;
+    if (found && boot != current && found->ended > after) result.boots.push_back(*found);
   }
   std::sort(result.boots.begin(), result.boots.end(),
             [](const EndedBoot& a, const EndedBoot& b) { return a.ended < b.ended; });
+  const auto panicked = panickedRuns(result.boots, currentBegan, signs.panics);
   for (EndedBoot& boot : result.boots) {
     boot.reason = orderlyEnd(folder, boot.boot, result.problem);
     if (!boot.reason.empty()) continue;
     const bool isLast = &boot == &result.boots.back();
-    boot.reason = kernelPanicked(folder, boot.boot, result.problem) ? "panic"
-                  : isLast && watchdogFired                         ? "watchdog"
-                                                                    : "unclean";
+    if (panicked.contains(&boot) || kernelPanicked(folder, boot.boot, result.problem))
+      boot.reason = "panic";
+    else
+      boot.reason = isLast && signs.watchdogFired ? "watchdog" : "unclean";
   }
   return result;
 }

@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "sources/boots/KernelDumps.h"
+
 namespace kyt::sources {
 
 struct EndedBoot {
@@ -16,15 +18,20 @@ struct EndedBoot {
   std::string reason;
 };
 
+// What the machine itself keeps over a start.
+struct KeptSigns {
+  bool watchdogFired = false;  // the hardware says that it reset the machine, before the current run began
+  PanicDumps panics;
+};
+
 // Runs other than `current` whose last entry is later than `after` (microseconds since 1970), the oldest first; or why
-// the journal in that folder (empty: this machine's) cannot be read. `watchdogFired`: the hardware says that it reset the
-// machine, before `current` began.
+// the journal in that folder (empty: this machine's) cannot be read.
 struct EndedBoots {
   std::vector<EndedBoot> boots;
   std::string problem;
 };
 [[nodiscard]] EndedBoots endedBoots(const std::string& folder, const std::string& current, uint64_t after,
-                                    bool watchdogFired);
+                                    const KeptSigns& signs);
 
 // How long the start took until the service manager was done, in milliseconds; none: it is not done, or says nothing.
 [[nodiscard]] std::optional<uint64_t> startupMilliseconds(const std::string& folder, const std::string& boot);

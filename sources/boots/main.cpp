@@ -27,7 +27,7 @@ constexpr uint64_t kMicroseconds = 1'000'000;
 constexpr size_t kMostBoots = 100;  // in one report; of more, the latest
 
 struct Options {
-  std::string socket, state, journal, root, boot;
+  std::string socket, state, journal, root, pstore, boot;
   int clientType = 12, patience = 30, settle = 300, retry = 900;
   bool once = false;
 };
@@ -92,7 +92,9 @@ class Boots {
     State state = readState(options_.state).value_or(State{});
     Told told = toldBy(state.position);
     const bool isFirst = state.position.empty();
-    EndedBoots ended = endedBoots(options_.journal, current_, told.until, watchdogFired(options_));
+    EndedBoots ended = endedBoots(
+        options_.journal, current_, told.until,
+        {watchdogFired(options_), panicDumps(options_.pstore.empty() ? options_.root : options_.pstore)});
     if (!ended.problem.empty()) return tell(ended.problem);
     if (!ended.boots.empty()) told.until = ended.boots.back().ended;
     // What was before the service was enabled is not told.
@@ -154,6 +156,7 @@ int main(int argc, char** argv) {
   line.option("--state", options.state, "The file that says what was reported").showsDefault();
   line.option("--journal", options.journal, "A folder of journal files in place of this machine's");
   line.option("--root", options.root, "A folder in front of /proc and /sys");
+  line.option("--pstore", options.pstore, "A folder in front of the kernels' dumps instead");
   line.option("--boot", options.boot, "The identifier of this run, as the journal has it");
   line.flag("--once", options.once, "Wait for nothing, and try once");
   if (const auto status = line.parse(argc, argv)) return *status;

@@ -28,11 +28,20 @@ class BootsSource : public SourceOnAStage {
   }
   std::vector<std::string> reasons(bool watchdogFired = false, uint64_t after = 0) {
     journal_.write();
-    const auto ended = sources::endedBoots(journal_.folder(), kCurrent, after, watchdogFired);
+    const auto ended = sources::endedBoots(journal_.folder(), kCurrent, after,
+                                           {watchdogFired, sources::panicDumps(folder_ / "root")});
     EXPECT_EQ(ended.problem, "");
     std::vector<std::string> reasons;
     for (const auto& boot : ended.boots) reasons.push_back(boot.reason);
     return reasons;
+  }
+  // A dump of a dying kernel's, of a time in microseconds since 1970.
+  void dump(const std::string& file, const std::string& text, uint64_t time) {
+    const std::filesystem::path path = folder_ / ("root/" + file);
+    std::filesystem::create_directories(path.parent_path());
+    folder_.write("root/" + file, text);
+    const std::chrono::sys_time<std::chrono::microseconds> when{std::chrono::microseconds(time)};
+    std::filesystem::last_write_time(path, std::chrono::file_clock::from_sys(when));
   }
   using Reasons = std::vector<std::string>;
   WrittenJournal journal_;
@@ -55,6 +64,93 @@ TEST_F(BootsSource, TellsAPanicAWatchdogAndAnUncleanEndApart) {
   EXPECT_EQ(reasons(true), (Reasons{"panic", "unclean", "watchdog"}));
 }
 
+TEST_F(BootsSource, FindsThePanicOfTheRunInWhichItsDumpWasWritten) {
+  run(kFirst);
+  run(kSecond);
+  const uint64_t end = journal_.nextTime();
+  run(kThird, {reached("reboot.target")});
+  journal_.setNextTime(journal_.nextTime() + 60'000'000);
+  run(kCurrent);
+  dump("sys/fs/pstore/dmesg-efi_pstore-1", "Panic#1 Part1\n<0>Kernel panic - not syncing\n", end + 500);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "unclean", "reboot"})) << "the reboot went through";
+  dump("sys/fs/pstore/dmesg-efi_pstore-2", "Panic#1 Part1\n", end - 500);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "panic", "reboot"}));
+  dump("sys/fs/pstore/dmesg-efi_pstore-3", "Panic#2 Part1\n", WrittenJournal::kBegin - 1);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "panic", "reboot"})) << "older than all";
+}
+
+TEST_F(BootsSource, TakesADumpWithoutATimeForTheLastRuns) {
+  run(kFirst);
+  run(kSecond);
+  run(kCurrent);
+  dump("sys/fs/pstore/dmesg-ramoops-0", "Panic#1 Part1\n", 0);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "panic"}));
+}
+
+TEST_F(BootsSource, FindsThePanicWhoseDumpWasMovedInThisRun) {
+  run(kFirst);
+  run(kSecond);
+  const uint64_t began = journal_.nextTime();
+  run(kCurrent);
+  dump("var/lib/systemd/pstore/1/001/dmesg-efi_pstore-1", "Panic#1 Part1\n", began - 1);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "unclean"})) << "moved in a run before: told then";
+  dump("var/lib/systemd/pstore/2/001/dmesg-efi_pstore-1", "Panic#1 Part1\n", began + 1);
+  EXPECT_EQ(reasons(), (Reasons{"unclean", "panic"}));
+}
+
+TEST_F(BootsSource, TakesNothingElseInPersistentMemoryForAPanic) {
+  run(kFirst);
+  run(kCurrent);
+  dump("sys/fs/pstore/dmesg-erst-1", "Oops#1 Part1\n<1>BUG: Kernel panic is not what this is\n", 0);
+  dump("sys/fs/pstore/dmesg-erst-2", "", 0);
+  dump("sys/fs/pstore/dmesg-erst-3.enc.z", std::string("\x1f\x8b Panic#1", 11), 0);
+  dump("sys/fs/pstore/console-ramoops-0", "Panic#1 Part1\n", 0);
+  std::filesystem::create_directory(folder_ / "root/sys/fs/pstore/dmesg-folder");
+  std::filesystem::create_symlink(folder_ / "nowhere", folder_ / "root/sys/fs/pstore/dmesg-link");
+  EXPECT_EQ(reasons(), Reasons{"unclean"});
+}
+
+// What the unit runs as root before the source, with other folders in the place of the machine's.
+TEST_F(BootsSource, GetsTheFirstLineOfEachDumpFromItsUnit) {
+  const std::string unit = std::get<std::string>(
+      tools::readFile(std::string(KYT_SOURCE_DIR) + "/packaging/systemd/kytsource-boots.service.in"));
+  const std::string begin = "ExecStartPre=-+/bin/sh -c '";
+  const size_t at = unit.find(begin);
+  ASSERT_NE(at, std::string::npos);
+  std::string script = unit.substr(at + begin.size(), unit.find("'\n", at) - at - begin.size());
+  const auto replaceAll = [&script](const std::string& what, const std::string& with) {
+    ASSERT_NE(script.find(what), std::string::npos) << what;
+    for (size_t i = script.find(what); i != std::string::npos; i = script.find(what, i + with.size()))
+      script.replace(i, what.size(), with);
+  };
+  replaceAll("$$", "$");
+  replaceAll("%%", "%");
+  replaceAll("cd / ", "cd '" + (folder_ / "root") + "' ");
+  replaceAll("/run/kytsource-boots", folder_ / "copies");
+
+  run(kFirst);
+  run(kSecond);
+  const uint64_t between = journal_.nextTime();
+  run(kThird);
+  run(kCurrent);
+  journal_.write();
+  dump("sys/fs/pstore/dmesg-efi_pstore-1", "Panic#1 Part1\n<6>the user's secrets\n", between - 500);
+  dump("var/lib/systemd/pstore/1/001/dmesg-efi_pstore-2", "Oops#1 Part1\n", between);
+  const ProgramRun copied = runProgram("sh", {"-c", script});
+  EXPECT_EQ(copied.status, 0) << copied.text;
+  EXPECT_EQ(folder_.read("copies/sys/fs/pstore/dmesg-efi_pstore-1"), "Panic#1 Part1\n");
+  EXPECT_EQ(folder_.read("copies/var/lib/systemd/pstore/1/001/dmesg-efi_pstore-2"), "Oops#1 Part1\n");
+  const auto panics = sources::panicDumps(folder_ / "copies");
+  EXPECT_EQ(panics.written, std::vector<uint64_t>{between - 500});
+  EXPECT_EQ(panics.moved, std::vector<uint64_t>{});
+  std::filesystem::remove_all(folder_ / "root/sys");
+  std::filesystem::remove_all(folder_ / "root/var");
+  const ProgramRun none = runProgram("sh", {"-c", script});
+  EXPECT_EQ(none.status, 0) << "most machines have no dumps";
+  EXPECT_EQ(none.text, "");
+  EXPECT_FALSE(std::filesystem::exists(folder_ / "copies"));
+}
+
 TEST_F(BootsSource, BelievesTheServiceManagerAndTheKernelAlone) {
   run(kFirst, {reached("reboot.target", "4711"), anyLine("Kernel panic - not syncing: said by a program")});
   run(kCurrent);
@@ -71,7 +167,7 @@ TEST_F(BootsSource, LeavesOutWhatEndedBefore) {
 TEST_F(BootsSource, KnowsHowLongARunLasted) {
   run(kFirst);
   journal_.write();
-  const auto ended = sources::endedBoots(journal_.folder(), kCurrent, 0, false);
+  const auto ended = sources::endedBoots(journal_.folder(), kCurrent, 0, {});
   ASSERT_EQ(ended.boots.size(), 1U);
   EXPECT_NEAR(static_cast<double>(ended.boots[0].ended - ended.boots[0].began), 3.6e9, 1e6);
 }
