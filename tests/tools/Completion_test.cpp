@@ -21,6 +21,10 @@ _kyt "${COMP_WORDS[0]}" "${COMP_WORDS[COMP_CWORD]}" "${COMP_WORDS[COMP_CWORD-1]}
 printf '%s\n' "${COMPREPLY[@]}"
 )";
 
+constexpr const char* kPrograms[] = {
+    "kytctl",  "kytreportingd",   "kytreceiver",       "kytdevserver",    "kytfeed",
+    "kytdemo", "kytsource-units", "kytsource-crashes", "kytsource-boots", "kytsource-resources"};
+
 class Shell {
  public:
   virtual ~Shell() = default;
@@ -113,8 +117,7 @@ class Completion : public ::testing::TestWithParam<Kind> {
 };
 
 TEST_P(Completion, KnowsTheOptionsCommandsAndValuesThatHelpNames) {
-  for (const char* program : {"kytctl", "kytreportingd", "kytreceiver", "kytdevserver", "kytfeed", "kytdemo"})
-    expectWhatHelpNames(program);
+  for (const char* program : kPrograms) expectWhatHelpNames(program);
 }
 
 // Of a program, or one of its commands, and all below it.
@@ -131,8 +134,7 @@ void addFlags(Names& flags, const std::string& program, const std::vector<std::s
 // The others are told by their commands' options; bash takes the word behind any other option for its value.
 TEST(CompletionOfBash, KnowsWhichOptionsTakeNoValue) {
   Names flags = {"--help"};
-  for (const char* program : {"kytctl", "kytreportingd", "kytreceiver", "kytdevserver", "kytfeed", "kytdemo"})
-    addFlags(flags, program);
+  for (const char* program : kPrograms) addFlags(flags, program);
   const std::string text = textOf("packaging/completion/bash/kytctl");
   const size_t begin = text.find("_kyt_is_flag() {");
   ASSERT_NE(begin, std::string::npos);

@@ -1,0 +1,11 @@
+# fish completion for kytsource-crashes.
+complete -c kytsource-crashes -s h -l help -d 'Print help and exit'
+complete -c kytsource-crashes -l version -d 'Print the version and exit'
+complete -c kytsource-crashes -l period -x -d 'Seconds from what was found to its report'
+complete -c kytsource-crashes -l client-type -x -d 'The session\'s client type'
+complete -c kytsource-crashes -l patience -x -d 'Seconds that a report may take'
+complete -c kytsource-crashes -l socket -r -d 'The daemon\'s socket'
+complete -c kytsource-crashes -l state -r -d 'The file that says what was reported'
+complete -c kytsource-crashes -l journal -x -a '(__fish_complete_directories)' -d 'Journal files in place of this machine\'s'
+complete -c kytsource-crashes -l units-from -x -a '(__fish_complete_directories)' -d 'Units that may be named'
+complete -c kytsource-crashes -l once -d 'Report what is there, and end'

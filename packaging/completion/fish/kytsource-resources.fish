@@ -1,0 +1,10 @@
+# fish completion for kytsource-resources.
+complete -c kytsource-resources -s h -l help -d 'Print help and exit'
+complete -c kytsource-resources -l version -d 'Print the version and exit'
+complete -c kytsource-resources -l period -x -d 'Seconds that a report sums up'
+complete -c kytsource-resources -l interval -x -d 'Seconds between two looks'
+complete -c kytsource-resources -l client-type -x -d 'The session\'s client type'
+complete -c kytsource-resources -l patience -x -d 'Seconds that a report may take'
+complete -c kytsource-resources -l socket -r -d 'The daemon\'s socket'
+complete -c kytsource-resources -l state -r -d 'The file that says what was reported'
+complete -c kytsource-resources -l root -x -a '(__fish_complete_directories)' -d 'In front of /proc, /sys and /var'

@@ -1,0 +1,11 @@
+# fish completion for kytsource-units.
+complete -c kytsource-units -s h -l help -d 'Print help and exit'
+complete -c kytsource-units -l version -d 'Print the version and exit'
+complete -c kytsource-units -l period -x -d 'Seconds from what was found to its report'
+complete -c kytsource-units -l client-type -x -d 'The session\'s client type'
+complete -c kytsource-units -l patience -x -d 'Seconds that a report may take'
+complete -c kytsource-units -l socket -r -d 'The daemon\'s socket'
+complete -c kytsource-units -l state -r -d 'The file that says what was reported'
+complete -c kytsource-units -l journal -x -a '(__fish_complete_directories)' -d 'Journal files in place of this machine\'s'
+complete -c kytsource-units -l units-from -x -a '(__fish_complete_directories)' -d 'Units that may be named'
+complete -c kytsource-units -l once -d 'Report what is there, and end'
