@@ -2,6 +2,9 @@
 #include "sources/Follower.h"
 
 #include <gtest/gtest.h>
+#include <time.h>
+
+#include <algorithm>
 
 #include "sources/units/UnitFindings.h"
 #include "tests/sources/WrittenJournal.h"
@@ -180,6 +183,34 @@ TEST_F(FollowedJournal, GivesALookThatTakesTooLongUpAndCountsTheRestAtTheNext) {
   EXPECT_GT(looks, 10);
   EXPECT_TRUE(follower_->report());
   EXPECT_EQ(told(), Lines{"1 cron.service 500"});
+}
+
+microseconds processorTime() {
+  timespec time = {};
+  ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &time);
+  return seconds(time.tv_sec) + microseconds(time.tv_nsec / 1000);
+}
+
+// Two seconds of ten thousand entries each. Looks are five seconds apart (see UnitsSource for the program).
+TEST_F(FollowedJournal, SumsAFloodUpInLooksThatTakeAHundredthOfTheTimeBetweenThem) {
+  constexpr int kFlood = 20'000;
+  budget_ = Follower::Options().lookBudget;
+  start();
+  for (int i = 0; i < kFlood; ++i) written_.add(failureOf(i % 2 == 0 ? "cron.service" : "ssh.service"));
+  written_.write();
+  now_ = written_.nextTime();
+  int looks = 0;
+  microseconds longest{0};
+  do {
+    const auto before = processorTime();
+    look();
+    longest = std::max(longest, processorTime() - before);
+    ++looks;
+  } while (follower_->isBehind() && looks < kFlood);
+  EXPECT_GT(looks, 1) << "a flood that one look can read shows nothing";
+  EXPECT_LT(longest, microseconds(seconds(5)) / 100);
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), (Lines{"1 cron.service 10000", "1 ssh.service 10000"}));
 }
 
 TEST_F(FollowedJournal, GoesOnAtThePresentWhereItIsFarBehindAndCountsWhatItPassedOver) {

@@ -1,8 +1,13 @@
 // kytsource-units in front of a real daemon and a server.
 #include "sources/units/UnitFindings.h"
 
+#include <sys/resource.h>
+
+#include <chrono>
+
 #include "tests/sources/EventsFile.h"
 #include "tests/sources/SourceFixture.h"
+#include "tests/support/Sanitizers.h"
 
 namespace kyt {
 namespace {
@@ -100,6 +105,50 @@ TEST_F(UnitsSource, ReportsTheFieldsThatItsEventsFileNames) {
     EXPECT_EQ(misdeclaredFields("units", event.category, event.type, event.payload), FieldNames())
         << event.type;
   }
+}
+
+// Of all children that were waited for.
+std::chrono::microseconds processorTimeOfChildren() {
+  rusage used = {};
+  ::getrusage(RUSAGE_CHILDREN, &used);
+  return std::chrono::seconds(used.ru_utime.tv_sec + used.ru_stime.tv_sec) +
+         std::chrono::microseconds(used.ru_utime.tv_usec + used.ru_stime.tv_usec);
+}
+
+// Ten seconds of ten thousand entries each, all there at once, and every one a failure: more than it reads in this time.
+TEST_F(UnitsSource, SpendsAHundredthOfAProcessorOnAFloodAndPassesOneEventOn) {
+  if (kSanitized) GTEST_SKIP() << "a sanitizer has costs of its own";
+  constexpr int kFlood = 100'000;
+  lay("units", "emrit");
+  journal_.add(anyLine("nothing"));
+  journal_.write();
+  // What it takes to start, to find nothing, and to end.
+  auto all = arguments();
+  const auto atFirst = processorTimeOfChildren();
+  EXPECT_EQ(run(all).status, 0);
+  const auto starting = processorTimeOfChildren() - atFirst;
+
+  for (int i = 0; i < kFlood; ++i) journal_.add(failureOf("cron.service"));
+  journal_.write();
+  all.insert(all.end(), {"--period", "20", "--socket", stage_->socketPath()});
+  tools::ChildProcess::Options how;
+  how.outputFile = folder_ / "output";
+  const auto before = processorTimeOfChildren();
+  const auto began = std::chrono::steady_clock::now();
+  auto source = tools::ChildProcess::start(stage_->program("kytsource-units"), all, how);
+  ASSERT_TRUE(source);
+  const auto events = arrivedUnits(1);
+  source->signal(SIGTERM);
+  EXPECT_EQ(source->wait(std::chrono::seconds(60)), 0) << folder_.read("output");
+  const auto elapsed =
+      std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::steady_clock::now() - began);
+  const auto spent = processorTimeOfChildren() - before;
+  EXPECT_LT((spent - starting).count(), elapsed.count() / 100)
+      << "starting takes " << starting.count() << " us, all took " << spent.count() << " us";
+  ASSERT_EQ(events.size(), 1U);
+  const int count = events.front().dictionary("record")->integer("count");
+  EXPECT_GT(count, 1000);
+  EXPECT_LT(count, kFlood) << "all of the flood was read: that shows nothing of its share";
 }
 
 }  // namespace
