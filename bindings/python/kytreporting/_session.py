@@ -5,6 +5,7 @@ from __future__ import annotations
 import asyncio
 import atexit
 import concurrent.futures
+import contextlib
 import ctypes
 import enum
 import functools
@@ -16,7 +17,7 @@ import threading
 import time
 import weakref
 from types import TracebackType
-from typing import Any, Callable, Dict, List, Mapping, Optional, Sequence, Tuple, Type, Union
+from typing import Any, Callable, Dict, Iterator, List, Mapping, Optional, Sequence, Tuple, Type, Union
 
 from . import _calls
 from ._aggregation import Aggregated, aggregated
@@ -71,7 +72,25 @@ class _Places(threading.local):
 _places = _Places()
 _sessions: "weakref.WeakValueDictionary[int, Session]" = weakref.WeakValueDictionary()
 _numbers = itertools.count(1)
-_program: Dict[str, bool] = {"ended": False}
+
+
+class _Program:
+    """Nothing of the library's is opened once the program has ended: its answer would come to no interpreter."""
+
+    def __init__(self) -> None:
+        self.opening = threading.RLock()  # while something is; a callback of a call that fails at once may open more
+        self.ended = False
+
+    @contextlib.contextmanager
+    def goes_on(self) -> Iterator[None]:
+        """While this lasts the program does not end."""
+        with self.opening:
+            if self.ended:
+                raise ClosedError("the program ends")
+            yield
+
+
+_program = _Program()
 
 
 # The library's thread calls these two with the interpreter's lock, which ctypes takes. An exception goes to
@@ -205,9 +224,8 @@ class Session:
             if self._pointer is None:
                 if self._ended:
                     raise ClosedError("the session is closed")
-                if _program["ended"]:
-                    raise ClosedError("the program ends")
-                self._pointer = self._opened()
+                with _program.goes_on():
+                    self._pointer = self._opened()
             return self._pointer
 
     def _opened(self) -> int:
@@ -522,10 +540,11 @@ def send_single(
             options.session_info = session_info.pointer
             if user_entries is not None:
                 options.user_info = user.pointer
-            number, future = _calls.begin()
-            lib.kyt_send_single_message(
-                ctypes.byref(options), category, type, message.pointer, _calls.on_text, number
-            )
+            with _program.goes_on():
+                number, future = _calls.begin()
+                lib.kyt_send_single_message(
+                    ctypes.byref(options), category, type, message.pointer, _calls.on_text, number
+                )
     return _calls.wait(future, timeout) or ""
 
 
@@ -538,12 +557,14 @@ def _at_exit() -> None:
                 session.finish(max(0.0, end - time.monotonic()))
             except Error as error:  # of a counter's last message
                 print(f"kytreporting: {error}", file=sys.stderr)
-    _program["ended"] = True
+    with _program.opening:
+        _program.ended = True
     lib.kyt_close_all()
 
 
 def _after_fork_in_child() -> None:
     _calls.forget_all()
+    _program.opening = threading.RLock()  # another thread may have held it
     for session in list(_sessions.values()):
         session._leave_to_parent()
 

@@ -50,6 +50,25 @@ def test_no_answer_reaches_an_interpreter_that_has_ended(kyt_listener, program):
         )
 
 
+def test_nothing_is_sent_any_more_once_the_program_has_ended(kyt_listener, program):
+    # What is registered first runs last: after the module has ended all that it had.
+    said = program(
+        """
+        import atexit
+        def late():
+            try:
+                kyt.send_single(1, 2, client_type=20)
+            except kyt.ClosedError as error:
+                print(error)
+        atexit.register(late)
+        import kytreporting as kyt
+        kyt.send_single(1, 1, client_type=20)
+        """
+    )
+    assert said == "the program ends\n"
+    assert [event["type"] for event in kyt_listener.events("message")] == [1]
+
+
 def test_an_error_in_a_callback_is_told_and_harms_nobody(kyt_listener, program):
     said = program(
         """
