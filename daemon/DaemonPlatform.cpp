@@ -89,6 +89,7 @@ DaemonPlatform::DaemonPlatform(Start start)
           .timers = *reactor,
           .reactor = *reactor,
           .executor = workers,
+          .largeWork = largeWork,
           .random = random,
           .userDefaults = userDefaults,
           .deviceProperties = deviceProperties,

@@ -38,6 +38,7 @@
 #include "platform/linux/service/JournalPowerLog.h"
 #include "platform/linux/toml/TomlBundle.h"
 #include "platform/linux/url/CurlURLSession.h"
+#include "platform/queues/LargeWork.h"
 #include "platform/queues/Log.h"
 #include "platform/queues/WorkerPool.h"
 
@@ -69,6 +70,7 @@ struct DaemonPlatform {
   ServerRecords servers;
   const std::unique_ptr<EpollReactor> reactor;
   WorkerPool workers;
+  LargeWork largeWork;
   LinuxRandom random;
   LinuxMemoryInfo memory;
   OpenSSLCryptography cryptography;

@@ -16,6 +16,7 @@ class DiagnosticsConsent;
 class Executor;
 class FileExtensions;
 class JSON;
+class LargeWork;
 class Log;
 class MemoryInfo;
 class PluginBundles;
@@ -38,6 +39,7 @@ struct Platform {
   TimerService& timers;
   Reactor& reactor;
   Executor& executor;
+  LargeWork& largeWork;
   RandomSource& random;
   UserDefaults& userDefaults;
   DeviceProperties& deviceProperties;

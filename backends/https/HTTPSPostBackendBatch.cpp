@@ -5,12 +5,12 @@
 
 #include "backends/https/HTTPSPostBackend.h"
 #include "platform/Platform.h"
-#include "platform/base/Blocking.h"
 #include "platform/base/Counters.h"
 #include "platform/base/Limits.h"
 #include "platform/base/UserBudget.h"
 #include "platform/objects/Keys.h"
 #include "platform/objects/ObjectSize.h"
+#include "platform/queues/LargeWork.h"
 #include "platform/queues/LineLimits.h"
 #include "platform/queues/LineOrder.h"
 #include "platform/queues/Log.h"
@@ -20,8 +20,8 @@ namespace kyt {
 
 namespace {
 
-// Bytes of a batch, or of the message made of it, that take some ten milliseconds to write and compress: as long as a wait,
-// and no reason for other users' sessions to stand in line. Below, a worker more would cost more than it gives.
+// Bytes of a batch, or of the message made of it, that take some ten milliseconds to write and compress: large work. Below, a
+// worker more would cost more than it gives.
 constexpr size_t kTakesLong = 256u << 10;
 
 Error localError(const char* text) {
@@ -184,21 +184,29 @@ Value HTTPSPostBackend::flush(FlushCompletion completion, TextOf text) {
 
 Value HTTPSPostBackend::postBatch(EventBatch::Taken batch, uint64_t bytes, FlushCompletion completion,
                                   TextOf text) {
-  std::optional<BlockingScope> blocking;
-  if (bytes >= kTakesLong) blocking.emplace();
   const PostRequest post(configuration_, postFacts());
   const bool mayBeShown = post.mayBeShown();
   const bool mayGoBeside =
       !completion && text == TextOf::flush && bytes >= PostLine::kLeastBytes && decision_.postURL;
+  std::optional<LargeWork::Scope> large;
+  // What is posted beside may need a place in that line itself.
+  const auto beginLarge = [&] {
+    line_.finish();
+    large.emplace(platform().largeWork);
+  };
+  if (bytes >= kTakesLong && mayGoBeside) large.emplace(platform().largeWork);
+  if (bytes >= kTakesLong && !mayGoBeside) beginLarge();
   showFate(batch.events, batch.records, std::nullopt);
   PostRequest::Message message = makeMessage(post, std::move(batch.records));
-  if (!blocking && message.json.size() >= kTakesLong) blocking.emplace();
   Value pretty;
   if (mayBeShown && (text == TextOf::flushAndEvent || isAnswerWanted(message.prettySize)))
     pretty = PostRequest::prettyText(message.json);
-  if (mayGoBeside && pretty.isNull()) {
+  const bool goesBeside = mayGoBeside && pretty.isNull();
+  if (mayGoBeside) large.reset();
+  if (goesBeside) {
     postBeside(std::move(message), std::move(batch.events), bytes);
   } else {
+    if (!large && message.json.size() >= kTakesLong) beginLarge();
     giveBackToUser(bytes);  // the request counts by itself
     FlushCompletion answer;
     if (completion)
@@ -225,8 +233,9 @@ void HTTPSPostBackend::postBeside(PostRequest::Message message, BookedEvents eve
         const LineOrder::Scope lines(place);
         const std::shared_ptr<UserAccount> account = post.reply.account;
         const ClientScope scope(account ? std::optional(account->user()) : std::nullopt);
-        std::optional<BlockingScope> blocking;
-        if (bytes >= kTakesLong) blocking.emplace();
+        std::optional<LargeWork::Scope> large;
+        if (bytes >= kTakesLong || message.json.size() >= kTakesLong)
+          large.emplace(post.reply.platform.largeWork);
         if (account != nullptr) account->giveBack(Share::bytes, bytes);
         if (message.events == 0) post.reply.events.dropped(Reason::postWithoutClientID);
         std::move(post).send(std::move(message.json));

@@ -15,10 +15,17 @@ constexpr Duration kSlice = std::chrono::milliseconds(1);  // some hundred threa
 
 }  // namespace
 
+bool FairLock::takeFree() {
+  const unsigned free = free_.load(std::memory_order_relaxed);
+  if (free == 0) return false;
+  free_.store(free - 1, std::memory_order_relaxed);
+  return true;
+}
+
 bool FairLock::tryTake() {
-  if (held_.load(std::memory_order_relaxed)) return false;
+  if (free_.load(std::memory_order_relaxed) == 0) return false;
   MutexLock lock(mutex_);
-  return !held_.exchange(true, std::memory_order_relaxed);
+  return takeFree();
 }
 
 void FairLock::take() {
@@ -28,15 +35,16 @@ void FairLock::take() {
   }
   const BlockingScope blocking(BlockingKind::inLine);
   MutexLock lock(mutex_);
-  if (!held_.exchange(true, std::memory_order_relaxed)) return;
+  if (takeFree()) return;
   Waiter self{.owner = SerialQueue::ownerOfThread()};
   enqueue(self);
   while (!self.granted) {
     self.changed.wait(mutex_);
     if (self.granted) return;
     self.woken = false;
-    if (firstLine_ != &self || held_.exchange(true, std::memory_order_relaxed)) continue;
+    if (firstLine_ != &self || !takeFree()) continue;
     popFirst();
+    if (firstLine_ != nullptr && free_.load(std::memory_order_relaxed) != 0) wakeFirst();
     return;
   }
 }
@@ -44,7 +52,10 @@ void FairLock::take() {
 // Who waits is told under the mutex: he may be gone as soon as it is free.
 void FairLock::giveBack() {
   MutexLock lock(mutex_);
-  if (firstLine_ == nullptr) return held_.store(false, std::memory_order_relaxed);
+  if (firstLine_ == nullptr) {
+    free_.store(free_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+    return;
+  }
   const MonotonicTime now = std::chrono::steady_clock::now();
   if (now - passed_ >= kSlice) {
     passed_ = now;
@@ -52,7 +63,11 @@ void FairLock::giveBack() {
     next->granted = true;
     return next->changed.notifyOne();
   }
-  held_.store(false, std::memory_order_relaxed);
+  free_.store(free_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+  wakeFirst();
+}
+
+void FairLock::wakeFirst() {
   if (!std::exchange(firstLine_->woken, true)) firstLine_->changed.notifyOne();
 }
 

@@ -1,4 +1,4 @@
-// A lock that users take turns at, below Monitor and Gate. Threads that wait for it stand in a line of their user's (the
+// A lock that users take turns at, below Monitor and Gate; one for several holders at a time below LargeWork. Threads that wait for it stand in a line of their user's (the
 // owner of the queue that they run), and the users take turns: however many threads of one user wait, the first one of
 // another user's is at most one place behind each user's. Within a line the order is that of arrival.
 //
@@ -20,7 +20,7 @@ namespace kyt {
 
 class FairLock {
  public:
-  FairLock() = default;
+  explicit FairLock(unsigned holders = 1) : free_(holders) {}
   FairLock(const FairLock&) = delete;
   FairLock& operator=(const FairLock&) = delete;
   void take();
@@ -41,9 +41,11 @@ class FairLock {
   void enqueue(Waiter& waiter) REQUIRES(mutex_);
   void appendLine(Waiter& first) REQUIRES(mutex_);
   Waiter* popFirst() REQUIRES(mutex_);
+  [[nodiscard]] bool takeFree() REQUIRES(mutex_);
+  void wakeFirst() REQUIRES(mutex_);
 
   Mutex mutex_;
-  std::atomic<bool> held_{false};  // written under the mutex
+  std::atomic<unsigned> free_;  // that many more may hold it; written under the mutex
   Waiter* firstLine_ GUARDED_BY(mutex_) = nullptr;
   Waiter* lastLine_ GUARDED_BY(mutex_) = nullptr;
   MonotonicTime passed_ GUARDED_BY(mutex_);  // when it was passed to a waiter last

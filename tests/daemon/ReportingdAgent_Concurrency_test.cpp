@@ -28,6 +28,7 @@ TEST_F(AgentFixture, SessionsOfOneHierarchyMayChangeEachOtherFromManyThreads) {
       .timers = fakes.timers,
       .reactor = fakes.reactor,
       .executor = fakes.executor,
+      .largeWork = fakes.largeWork,
       .random = fakes.random,
       .userDefaults = fakes.userDefaults,
       .deviceProperties = fakes.deviceProperties,

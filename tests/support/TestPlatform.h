@@ -33,6 +33,7 @@
 #include "platform/linux/data/PugixmlPropertyLists.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "platform/linux/data/ZlibDeflate.h"
+#include "platform/queues/LargeWork.h"
 #include "platform/queues/Log.h"
 
 namespace kyt {
@@ -48,6 +49,7 @@ struct TestPlatform {
   ManualTimers timers{clock};
   ManualReactor reactor;
   ManualExecutor executor;
+  LargeWork largeWork{1};  // what would wait for itself shows
   FixedRandom random;
   FakeUserDefaults userDefaults;
   FakeDeviceProperties deviceProperties;
@@ -74,6 +76,7 @@ struct TestPlatform {
       .timers = timers,
       .reactor = reactor,
       .executor = executor,
+      .largeWork = largeWork,
       .random = random,
       .userDefaults = userDefaults,
       .deviceProperties = deviceProperties,

@@ -32,6 +32,7 @@
 #include "platform/fake/MemoryStream.h"
 #include "platform/ipc/fake/FakeListener.h"
 #include "platform/objects/Keys.h"
+#include "platform/queues/LargeWork.h"
 #include "session/MessageLog.h"
 #include "session/ReportingdSession.h"
 #include "session/ReportingdSessionClass.h"
@@ -109,6 +110,7 @@ struct Rehearsal::Parts {
                  .timers = timers,
                  .reactor = reactor,
                  .executor = executor,
+                 .largeWork = largeWork,
                  .random = random,
                  .userDefaults = defaults,
                  .deviceProperties = device.deviceProperties,
@@ -260,6 +262,7 @@ struct Rehearsal::Parts {
   ManualTimers timers{clock};
   ManualReactor reactor;
   ManualExecutor executor;
+  LargeWork largeWork;
   FixedRandom random;
   ScratchUserDefaults defaults;
   FakeURLSessionFactory urlSessions;

@@ -29,6 +29,7 @@
 #include "platform/linux/service/JournalPowerLog.h"
 #include "platform/linux/service/LogSinks.h"
 #include "platform/linux/url/CurlURLSession.h"
+#include "platform/queues/LargeWork.h"
 #include "platform/queues/WorkerPool.h"
 
 namespace kyt::tools {
@@ -51,6 +52,7 @@ struct Machine {
   LinuxClock clock;
   std::unique_ptr<EpollReactor> reactor = EpollReactor::create();
   WorkerPool workers{WorkerPoolOptions{}};
+  LargeWork largeWork;
   LinuxRandom random;
   LinuxMemoryInfo memory;
   OpenSSLCryptography cryptography;
@@ -76,6 +78,7 @@ struct Machine {
       .timers = *reactor,
       .reactor = *reactor,
       .executor = workers,
+      .largeWork = largeWork,
       .random = random,
       .userDefaults = userDefaults,
       .deviceProperties = deviceProperties,

@@ -69,6 +69,7 @@ class DashboardSockets : public ::testing::Test {
       .timers = *reactor_,
       .reactor = *reactor_,
       .executor = workers_,
+      .largeWork = fakes_.largeWork,
       .random = fakes_.random,
       .userDefaults = fakes_.userDefaults,
       .deviceProperties = fakes_.deviceProperties,

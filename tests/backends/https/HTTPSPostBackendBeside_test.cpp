@@ -58,6 +58,24 @@ TEST_F(HTTPSPostBackendBeside, ALargeBatchIsPostedByAnotherThread) {
     EXPECT_EQ(events(0)[static_cast<size_t>(i)].find("number")->intValue(), i);
 }
 
+// One large batch may be written at a time here: what waits beside needs that place, and the flush behind it too.
+TEST_F(HTTPSPostBackendBeside, AFlushBehindLargeBatchesThatWaitDoesNotWaitForItself) {
+  decided();
+  const std::string much(8000, 'm');
+  const auto sendLargeBatch = [&](int events) {
+    for (int i = 0; i < events; ++i) send(5, Dictionary{{"number", i}, {"text", much}});
+  };
+  sendLargeBatch(kEvents + 1);
+  sendLargeBatch(kEvents);
+  sendLargeBatch(40);
+  EXPECT_TRUE(poster_->requests.empty());
+  FlushAnswer answer;
+  backend().flushMessagesWithCompletion(answer.completion());
+  ASSERT_EQ(poster_->requests.size(), 3u);
+  EXPECT_EQ(events(0).size(), static_cast<size_t>(kEvents));
+  EXPECT_EQ(events(2).size(), 41u);
+}
+
 TEST_F(HTTPSPostBackendBeside, EventsThatLeaveTheirMessageForWantOfAClientIDCountOnce) {
   entry_.set("extras_on_internal", 1);
   facts_.isInternal = true;

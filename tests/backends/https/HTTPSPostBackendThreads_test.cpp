@@ -110,6 +110,39 @@ TEST_F(HTTPSPostBackendThreads, ARepliesThreadMayDropTheLastReference) {
   }
 }
 
+// Sessions of which all end at once write and compress no more batches at a time than there are processors: each holds its
+// text besides its records meanwhile.
+TEST_F(HTTPSPostBackendThreads, OfManyLargeBatchesAsManyAreCompressedAtATimeAsThereArePlaces) {
+  constexpr int kBackends = 6;
+  entry_.set("event_threshold", 10000);
+  std::vector<std::shared_ptr<HTTPSPostBackend>> backends;
+  for (int i = 0; i < kBackends; ++i) {
+    backend_ = nullptr;
+    decided();
+    for (int k = 0; k < 20; ++k) send(5, {{"text", std::string(50000, 'x')}});
+    backends.push_back(backend_);
+  }
+  std::atomic<int> compressing{0}, most{0}, flushed{0};
+  WorkerPool pool(WorkerPoolOptions{});
+  platform_.deflate.faults.beforeFinish = [&] {
+    const int now = ++compressing;
+    if (now > most) most = now;
+    // All others have had the time to come here too.
+    if (flushed == 0) {
+      EXPECT_TRUE(eventually([&] { return pool.figures().blocked == static_cast<size_t>(kBackends); }));
+    }
+    --compressing;
+  };
+  for (const std::shared_ptr<HTTPSPostBackend>& backend : backends)
+    SerialQueue::create("flushes", pool)->async([&flushed, backend] {
+      backend->flushMessagesWithCompletion([](const Value&, const std::optional<Error>&) {});
+      ++flushed;
+    });
+  EXPECT_TRUE(eventually([&] { return flushed == kBackends; }));
+  pool.shutDown();
+  EXPECT_EQ(most, 1) << "the platform of this test has one place";
+}
+
 // With one worker that may run, another session's work does not wait for a batch of a megabyte.
 TEST_F(HTTPSPostBackendThreads, OthersRunWhileALargeBatchIsCompressed) {
   for (const bool isLarge : {true, false}) {
