@@ -16,7 +16,8 @@
 #include <algorithm>
 #include <cstdlib>
 #include <fstream>
-#include <iterator>
+
+#include "tests/support/ReadFile.h"
 
 namespace kyt::devserver::test {
 namespace {
@@ -80,8 +81,7 @@ void TemporaryFolder::write(const std::string& name, std::string_view content) c
 }
 
 std::string TemporaryFolder::read(const std::string& name) const {
-  std::ifstream file(path_ / name, std::ios::binary);
-  return {std::istreambuf_iterator<char>(file), {}};
+  return readFile(path_ / name);
 }
 
 std::string Response::header(const std::string& name) const {

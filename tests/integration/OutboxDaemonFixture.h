@@ -15,6 +15,7 @@
 
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/TestClient.h"
+#include "tests/support/ReadFile.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
@@ -119,8 +120,7 @@ class OutboxOfTheDaemon : public ::testing::Test {
   }
   [[nodiscard]] std::string folder() const { return daemon_.root() / "var/lib/kytreportingd/outbox"; }
   [[nodiscard]] std::string ofProcess(const std::string& name) const {
-    std::ifstream file("/proc/" + std::to_string(daemon_.process()) + "/" + name);
-    return {std::istreambuf_iterator<char>(file), {}};
+    return readFile("/proc/" + std::to_string(daemon_.process()) + "/" + name);
   }
   [[nodiscard]] bool hasThread(const std::string& name) const {
     const std::string tasks = "/proc/" + std::to_string(daemon_.process()) + "/task";

@@ -7,10 +7,11 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <stdexcept>
 #include <string>
 #include <string_view>
+
+#include "tests/support/ReadFile.h"
 
 namespace kyt {
 
@@ -38,10 +39,7 @@ class TemporaryFolder {
     ::chmod(file.c_str(), mode);
     return file;
   }
-  [[nodiscard]] std::string read(std::string_view name) const {
-    std::ifstream in(*this / name, std::ios::binary);
-    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-  }
+  [[nodiscard]] std::string read(std::string_view name) const { return readFile(*this / name); }
 
  private:
   std::string path_;
