@@ -111,10 +111,12 @@ std::optional<AdministrationRefusal> Administration::Window::watch(const Diction
     return AdministrationRefusal{AdministrationRefusal::Why::notAllowed,
                                  "Only root and the daemon's own user may see what is in events"};
   watching_.reset();
-  std::unique_ptr<Watcher> watcher = all_.watch(std::move(wanted));
+  std::unique_ptr<Watcher> watcher = all_.watch(std::move(wanted), ownsDaemon_);
   if (watcher == nullptr)
-    return AdministrationRefusal{AdministrationRefusal::Why::tooMany,
-                                 std::to_string(Limits::maxWatchers) + " watch already: no more can"};
+    return AdministrationRefusal{
+        AdministrationRefusal::Why::tooMany,
+        std::to_string(ownsDaemon_ ? Limits::maxWatchers : Limits::maxWatchersOfGroup) +
+            " watch already: no more can"};
   watching_ = std::make_shared<Watching>(std::move(watcher), std::move(signal));
   Watching::start(watching_, all_.sources_.platform.timers, queue_);
   return std::nullopt;
@@ -143,8 +145,8 @@ std::optional<AdministrationRefusal> Administration::Window::dropOutbox(const Di
   return std::nullopt;
 }
 
-std::unique_ptr<Watcher> Administration::watch(WatchFilter filter) const {
-  return sources_.platform.books.watchers()->watch(std::move(filter));
+std::unique_ptr<Watcher> Administration::watch(WatchFilter filter, bool isOwner) const {
+  return sources_.platform.books.watchers()->watch(std::move(filter), isOwner);
 }
 
 Administration::Administration(AdministrationSources sources, AdministrationAccess access)

@@ -84,7 +84,7 @@ class Administration final : public ListenerDelegate {
   [[nodiscard]] bool hasOutbox() const { return sources_.outbox.view != nullptr; }
   [[nodiscard]] const OutboxOperations& outbox() const { return sources_.outbox; }
   // Begins to watch; null where the limit of watchers is reached.
-  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter) const;
+  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter, bool isOwner) const;
   [[nodiscard]] std::optional<std::string> reload(std::vector<std::string>& lines) const {
     return sources_.reload(lines);
   }

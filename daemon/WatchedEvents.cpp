@@ -83,7 +83,7 @@ Dictionary passedView(const PassedEvent& event, bool bodies) {
   view.set("status", event.post->status());
   if (!bodies || !event.isFirstOfPost) return view;
   view.set("bodyBytes", static_cast<uint64_t>(event.post->bodyBytes()));
-  view.set("body", event.post->body());
+  view.set("body", event.body != nullptr ? event.body->text() : std::string());
   return view;
 }
 

@@ -320,6 +320,8 @@ void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
 
 void BookedEvents::tellWatchers(PassedEvent fate) const {
   BookedEventsReader tallies(*this);
+  ToldBody body;
+  if (fate.isFirstOfPost) body.body = fate.post->body();
   for (size_t i = 0; i < size_; ++i) {
     const Tally* tally = tallies.next();
     const EventKind kind = i < shown_->kinds.size() ? shown_->kinds[i] : EventKind();
@@ -329,9 +331,9 @@ void BookedEvents::tellWatchers(PassedEvent fate) const {
     event.isKept = fate.isKept;
     event.rule = fate.rule;
     event.post = fate.post;
-    event.isFirstOfPost = fate.isFirstOfPost && i == 0;
-    shown_->watchers->tell(std::move(event));
+    shown_->watchers->tell(std::move(event), fate.isFirstOfPost ? &body : nullptr);
   }
+  if (fate.isFirstOfPost) shown_->post->forgetBody();
 }
 
 std::vector<BookedEvents::OfRow> BookedEvents::rows() const {

@@ -95,6 +95,7 @@ struct Limits {
   static constexpr size_t maxShownSessions = 2048;
   // Who watches events pass: each is looked for with every event while anybody watches.
   static constexpr size_t maxWatchers = 4;
+  static constexpr size_t maxWatchersOfGroup = maxWatchers - 1;  // root and the daemon's user find one free
   static constexpr size_t maxWatchedEvents = 1024;  // that wait for one: some 700 bytes each; a power of two
   static constexpr size_t maxWatchedBodyBytes = 65536;  // of one body, the beginning
   static constexpr size_t maxWatchedBodies = 4u

@@ -7,11 +7,26 @@
 
 namespace kyt {
 
+namespace {
+
+// One that reads nothing leaves room for the others' bodies, and for those on their way.
+constexpr size_t kMostBodiesOfWatcher = Limits::maxWatchedBodies / (Limits::maxWatchers + 1);
+
+}  // namespace
+
 struct Watchers::Ring {
   explicit Ring(WatchFilter f) : filter(std::move(f)) {}
   const WatchFilter filter;
   WatchRing<PassedEvent> events{Limits::maxWatchedEvents};
   std::atomic<uint64_t> lost{0};
+  std::atomic<size_t> bodyBytes{0};  // that wait in it
+
+  // Whether it has room for so many bytes of a body more, which it has now.
+  [[nodiscard]] bool takeRoom(size_t bytes) {
+    if (bodyBytes.fetch_add(bytes, std::memory_order_relaxed) + bytes <= kMostBodiesOfWatcher) return true;
+    bodyBytes.fetch_sub(bytes, std::memory_order_relaxed);
+    return false;
+  }
 };
 
 bool WatchFilter::admits(const ReportingProgram& program, EventKind kind) const {
@@ -19,8 +34,11 @@ bool WatchFilter::admits(const ReportingProgram& program, EventKind kind) const 
          (!category || *category == kind.category);
 }
 
-WatchedPost::~WatchedPost() {
-  watchers_->bodyBytes_.fetch_sub(body_.size(), std::memory_order_relaxed);
+WatchedBody::WatchedBody(std::shared_ptr<Watchers> watchers, std::string_view text)
+    : watchers_(std::move(watchers)), text_(text) {}
+
+WatchedBody::~WatchedBody() {
+  watchers_->bodyBytes_.fetch_sub(text_.size(), std::memory_order_relaxed);
 }
 
 void WatchedPost::leaves(std::string_view server, std::string_view body) {
@@ -29,17 +47,18 @@ void WatchedPost::leaves(std::string_view server, std::string_view body) {
   bodyBytes_ = body.size();
   if (!watchers_->wantsBodies()) return;
   const std::string_view kept = cutUTF8(body, Limits::maxWatchedBodyBytes);
-  if (watchers_->takeRoom(kept.size())) body_ = kept;
+  if (watchers_->takeRoom(kept.size())) body_ = std::make_shared<const WatchedBody>(watchers_, kept);
 }
 
 Watchers::Watchers() = default;
 Watchers::~Watchers() = default;
 
-std::unique_ptr<Watcher> Watchers::watch(WatchFilter filter) {
+std::unique_ptr<Watcher> Watchers::watch(WatchFilter filter, bool isOwner) {
+  const size_t most = isOwner ? Limits::maxWatchers : Limits::maxWatchersOfGroup;
   const bool bodies = filter.bodies;
   auto ring = std::make_unique<Ring>(std::move(filter));
   MutexLock lock(mutex_);
-  for (size_t i = 0; i < places_.size(); ++i) {
+  for (size_t i = most; i-- > 0;) {
     if (places_[i].ring.load() != nullptr) continue;
     places_[i].ring.store(ring.release());
     watching_.fetch_add(1, std::memory_order_relaxed);
@@ -53,29 +72,48 @@ std::unique_ptr<Watcher> Watchers::watch(WatchFilter filter) {
 // the two sees the other. Who finds no ring at first stays out, so that there is an end to the wait.
 template <typename Use>
 void Watchers::forEachRing(const ReportingProgram& program, EventKind kind, Use use) {
-  for (Place& place : places_) {
+  for (size_t number = 0; number < places_.size(); ++number) {
+    Place& place = places_[number];
     if (place.ring.load(std::memory_order_relaxed) == nullptr) continue;
     place.tellers.fetch_add(1);
     Ring* ring = place.ring.load();
-    if (ring != nullptr && ring->filter.admits(program, kind)) use(*ring);
+    if (ring != nullptr && ring->filter.admits(program, kind)) use(*ring, number);
     place.tellers.fetch_sub(1);
   }
 }
 
 bool Watchers::want(const ReportingProgram& program, EventKind kind) {
   bool hasRoom = false;
-  forEachRing(program, kind, [&hasRoom](const Ring& ring) { hasRoom = hasRoom || ring.events.hasRoom(); });
+  forEachRing(program, kind,
+              [&hasRoom](const Ring& ring, size_t) { hasRoom = hasRoom || ring.events.hasRoom(); });
   if (!hasRoom)
-    forEachRing(program, kind, [](Ring& ring) { ring.lost.fetch_add(1, std::memory_order_relaxed); });
+    forEachRing(program, kind, [](Ring& ring, size_t) { ring.lost.fetch_add(1, std::memory_order_relaxed); });
   return hasRoom;
 }
 
-void Watchers::tell(PassedEvent event) {
+void Watchers::tell(PassedEvent event, ToldBody* body) {
   event.program.clientName = cutName(event.program.clientName);
   event.program.service = cutName(event.program.service);
-  const auto shared = std::make_shared<const PassedEvent>(std::move(event));
-  forEachRing(shared->program, shared->kind, [&shared](Ring& ring) {
-    if (!ring.events.put(shared)) ring.lost.fetch_add(1, std::memory_order_relaxed);
+  const auto plain = std::make_shared<const PassedEvent>(std::move(event));
+  std::shared_ptr<const PassedEvent> withBody, withoutRoom;  // for those to whom it is the first of its post
+  const auto firstOf = [&plain](const std::shared_ptr<const WatchedBody>& text) {
+    PassedEvent first = *plain;
+    first.isFirstOfPost = true;
+    first.body = text;
+    return std::make_shared<const PassedEvent>(std::move(first));
+  };
+  forEachRing(plain->program, plain->kind, [&](Ring& ring, size_t place) {
+    const bool isFirst = body != nullptr && ring.filter.bodies && (body->had >> place & 1) == 0;
+    const size_t bytes = isFirst && body->body != nullptr ? body->body->text().size() : 0;
+    const bool getsBody = bytes != 0 && ring.takeRoom(bytes);
+    std::shared_ptr<const PassedEvent>& first = getsBody ? withBody : withoutRoom;
+    if (isFirst && first == nullptr) first = firstOf(getsBody ? body->body : nullptr);
+    if (ring.events.put(isFirst ? first : plain)) {
+      if (isFirst) body->had |= uint32_t{1} << place;
+      return;
+    }
+    ring.lost.fetch_add(1, std::memory_order_relaxed);
+    if (getsBody) ring.bodyBytes.fetch_sub(bytes, std::memory_order_relaxed);
   });
 }
 
@@ -99,7 +137,11 @@ Watcher::~Watcher() {
 
 // The place's ring is this watcher's until its end.
 std::shared_ptr<const PassedEvent> Watcher::next() {
-  return watchers_->places_[place_].ring.load()->events.take();
+  Watchers::Ring& ring = *watchers_->places_[place_].ring.load();
+  std::shared_ptr<const PassedEvent> event = ring.events.take();
+  if (event != nullptr && event->body != nullptr)
+    ring.bodyBytes.fetch_sub(event->body->text().size(), std::memory_order_relaxed);
+  return event;
 }
 
 uint64_t Watcher::takeLost() {

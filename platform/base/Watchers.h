@@ -29,11 +29,24 @@ struct EventKind {
 
 class Watchers;
 
+// The beginning of a request's body: counts as kept until nobody has it.
+class WatchedBody {
+ public:
+  WatchedBody(std::shared_ptr<Watchers> watchers, std::string_view text);
+  ~WatchedBody();
+  WatchedBody(const WatchedBody&) = delete;
+  WatchedBody& operator=(const WatchedBody&) = delete;
+  [[nodiscard]] const std::string& text() const { return text_; }
+
+ private:
+  const std::shared_ptr<Watchers> watchers_;
+  const std::string text_;
+};
+
 // A request that carries watched events. It has one user at a time until it is answered, and never changes then.
 class WatchedPost {
  public:
   explicit WatchedPost(std::shared_ptr<Watchers> watchers) : watchers_(std::move(watchers)) {}
-  ~WatchedPost();
   WatchedPost(const WatchedPost&) = delete;
   WatchedPost& operator=(const WatchedPost&) = delete;
 
@@ -41,17 +54,20 @@ class WatchedPost {
   // it and Limits::maxWatchedBodies has room, its first Limits::maxWatchedBodyBytes.
   void leaves(std::string_view server, std::string_view body);
   void answered(int status) { status_ = status; }
+  // Its events are told: who was given the body has it. The teller's, like body().
+  void forgetBody() { body_ = nullptr; }
 
   [[nodiscard]] uint64_t number() const { return number_; }  // 0: no request was made
   [[nodiscard]] const std::string& server() const { return server_; }
-  [[nodiscard]] const std::string& body() const { return body_; }
-  [[nodiscard]] size_t bodyBytes() const { return bodyBytes_; }  // of the whole text
-  [[nodiscard]] int status() const { return status_; }           // 0: no answer came
+  [[nodiscard]] const std::shared_ptr<const WatchedBody>& body() const { return body_; }  // null: not kept
+  [[nodiscard]] size_t bodyBytes() const { return bodyBytes_; }                           // of the whole text
+  [[nodiscard]] int status() const { return status_; }                                    // 0: no answer came
 
  private:
   const std::shared_ptr<Watchers> watchers_;
   uint64_t number_ = 0;
-  std::string server_, body_;
+  std::string server_;
+  std::shared_ptr<const WatchedBody> body_;
   size_t bodyBytes_ = 0;
   int status_ = 0;
 };
@@ -67,7 +83,15 @@ struct PassedEvent {
   const char* rule = "";  // what made a back end drop it, a word with hyphens; empty: the reason says all
   int64_t seconds = 0;    // since 1970
   std::shared_ptr<const WatchedPost> post;  // null: no request carried it
+  // For a watcher who wants bodies: the first event of the post that it is told, and the body, where there was room for it.
   bool isFirstOfPost = false;
+  std::shared_ptr<const WatchedBody> body;
+};
+
+// The body of a post while its events are told: each watcher who wants bodies gets it with the first that it is told.
+struct ToldBody {
+  std::shared_ptr<const WatchedBody> body;  // null: not kept
+  uint32_t had = 0;                         // bits of the watchers who have it
 };
 
 struct WatchFilter {
@@ -106,25 +130,27 @@ class Watchers : public std::enable_shared_from_this<Watchers> {
   Watchers(const Watchers&) = delete;
   Watchers& operator=(const Watchers&) = delete;
 
-  // Null where Limits::maxWatchers watch already.
-  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter);
+  // Null where Limits::maxWatchers watch already, or Limits::maxWatchersOfGroup of those who are not the daemon's owners.
+  [[nodiscard]] std::unique_ptr<Watcher> watch(WatchFilter filter, bool isOwner = true);
 
   // Asked before anything is made for telling.
   [[nodiscard]] bool anybody() const { return watching_.load(std::memory_order_relaxed) != 0; }
   // Whether somebody whose filter lets such an event through has room for it: asked before it is made. Where none has, it
   // counts as lost to them.
   [[nodiscard]] bool want(const ReportingProgram& program, EventKind kind);
-  void tell(PassedEvent event);
+  // `body`: of its post, until all events of that are told; null: nobody gets one.
+  void tell(PassedEvent event, ToldBody* body = nullptr);
 
  private:
   friend class Watcher;
   friend class WatchedPost;
+  friend class WatchedBody;
   struct Ring;
   struct Place {
     std::atomic<Ring*> ring{nullptr};
     std::atomic<uint32_t> tellers{0};  // that may be using it
   };
-  // Calls `use` with each ring whose filter lets it through, which is not taken away meanwhile.
+  // Calls `use` with each ring, and its place, whose filter lets it through, which is not taken away meanwhile.
   template <typename Use>
   void forEachRing(const ReportingProgram& program, EventKind kind, Use use);
   [[nodiscard]] bool wantsBodies() const { return wantingBodies_.load(std::memory_order_relaxed) != 0; }

@@ -285,21 +285,36 @@ TEST_F(AdministrationTest, KeepsNoBodyWhileThoseWatchWhoMayNotSeeOne) {
   ASSERT_EQ(watch(look(1000, {4}), {}, told), std::nullopt);
   const auto post = std::make_shared<WatchedPost>(test_.books.watchers());
   post->leaves("https://a", "what-is-in-it");
-  EXPECT_EQ(post->body(), "");
+  EXPECT_EQ(post->body(), nullptr);
   // Nor is one told that is kept for somebody else.
   ASSERT_EQ(watch(look(0), {{"bodies", true}}), std::nullopt);
   const auto kept = std::make_shared<WatchedPost>(test_.books.watchers());
   kept->leaves("https://a", "what-is-in-it");
-  ASSERT_EQ(kept->body(), "what-is-in-it");
+  ASSERT_EQ(kept->body()->text(), "what-is-in-it");
   PassedEvent event;
   event.post = kept;
-  event.isFirstOfPost = true;
-  test_.books.watchers()->tell(std::move(event));
+  ToldBody body{kept->body()};
+  test_.books.watchers()->tell(std::move(event), &body);
   letWatchersLook();
   ASSERT_EQ(told->events.size(), 1U);
   EXPECT_EQ(told->events[0].find("body"), nullptr);
   EXPECT_EQ(told->events[0].find("bodyBytes"), nullptr);
   EXPECT_EQ(*told->events[0].string("server"), "https://a");
+}
+
+TEST_F(AdministrationTest, LetsRootWatchHoweverManyOfTheGroupDo) {
+  std::vector<std::shared_ptr<FakeConnection>> members;
+  for (size_t i = 0; i < Limits::maxWatchersOfGroup; ++i) {
+    members.push_back(look(1000, {4}));
+    EXPECT_EQ(watch(members.back(), {}), std::nullopt);
+  }
+  const auto refused = watch(look(1001, {4}), {});
+  ASSERT_NE(refused, std::nullopt);
+  EXPECT_EQ(refused->text, "3 watch already: no more can");
+  EXPECT_EQ(watch(look(0), {}), std::nullopt);
+  EXPECT_EQ(watch(look(0), {})->text, "4 watch already: no more can");
+  members.back()->invalidateNow();
+  EXPECT_EQ(watch(look(1001, {4}), {}), std::nullopt);
 }
 
 TEST_F(AdministrationTest, RefusesAFilterThatItDoesNotUnderstand) {

@@ -145,6 +145,20 @@ TEST_F(KytctlWatch, ShowsBodiesInBothForms) {
   EXPECT_TRUE(bodySeen);
 }
 
+TEST_F(KytctlWatch, ShowsTheBodyOfAPostThatBeginsWithAnotherCategory) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  Running watch(root(), {"--bodies", "--category", "6"});
+  ASSERT_TRUE(watch.shows("FATE")) << watch.text();
+  TestClient client(socket(), 7, "a");
+  ASSERT_EQ(client.configure(), "live: httppost");
+  EXPECT_TRUE(client.send(5, 1, Dictionary{{"a", "first-of-the-post"}}));
+  EXPECT_TRUE(client.send(6, 1, Dictionary{{"a", "second-of-the-post"}}));
+  EXPECT_EQ(client.flush(), "flushed");
+  EXPECT_TRUE(watch.shows("second-of-the-post")) << watch.text();
+}
+
 TEST_F(KytctlWatch, FiltersByCategoryAndUser) {
   lay();
   putBag("cadmor", {entry("a")});

@@ -120,23 +120,23 @@ TEST_F(WatchersTest, KeepBodiesWhereSomebodyWantsThemAndThereIsRoom) {
     EXPECT_EQ(made->bodyBytes(), bytes);
     return made;
   };
-  EXPECT_EQ(post(10)->body(), "");
+  EXPECT_EQ(post(10)->body(), nullptr);
   const auto watcher = watchers_->watch({.bodies = true});
-  EXPECT_EQ(post(10)->body(), "bbbbbbbbbb");
+  EXPECT_EQ(post(10)->body()->text(), "bbbbbbbbbb");
   std::vector<std::shared_ptr<WatchedPost>> kept;
   for (size_t i = 0; i < Limits::maxWatchedBodies / Limits::maxWatchedBodyBytes; ++i) {
     kept.push_back(post(Limits::maxWatchedBodyBytes + 1));
-    ASSERT_EQ(kept.back()->body().size(), Limits::maxWatchedBodyBytes);
+    ASSERT_EQ(kept.back()->body()->text().size(), Limits::maxWatchedBodyBytes);
   }
-  EXPECT_EQ(post(10)->body(), "");
+  EXPECT_EQ(post(10)->body(), nullptr);
   kept.pop_back();
-  EXPECT_EQ(post(10)->body(), "bbbbbbbbbb");
+  EXPECT_EQ(post(10)->body()->text(), "bbbbbbbbbb");
 }
 
 TEST_F(WatchersTest, AreToldByTheBooksWhatBecameOfAPost) {
   Books books;
   Counters counters;
-  const auto watcher = books.watchers()->watch({});
+  const auto watcher = books.watchers()->watch({.bodies = true});
   const auto tally = books.open({1000, 7, "a", "s"}, "httppost", false);
   BookedEvents events;
   tally->take();
@@ -162,6 +162,100 @@ TEST_F(WatchersTest, AreToldByTheBooksWhatBecameOfAPost) {
   EXPECT_EQ(second->post->status(), 503);
   EXPECT_EQ(second->backEnd, "httppost");
   EXPECT_EQ(watcher->next(), nullptr);
+}
+
+// A post of events of the categories 5, 6 and 6, told to whoever watches.
+class BodiesOfWatchers : public ::testing::Test {
+ protected:
+  void post(const std::string& body) {
+    const auto tally = books_.open({1000, 7, "a", "s"}, "httppost", false);
+    BookedEvents events;
+    for (int i = 0; i < 3; ++i) {
+      tally->take();
+      events.add(tally.get());
+    }
+    const auto post = std::make_shared<WatchedPost>(books_.watchers());
+    post->leaves("https://a", body);
+    post->answered(200);
+    events.show({books_.watchers(), "httppost", "", {{5, 1}, {6, 1}, {6, 2}}, post});
+    PostedEvents(std::move(events), counters_).delivered();
+  }
+  static std::string bodyOf(const std::shared_ptr<const PassedEvent>& event) {
+    if (event == nullptr) return "no event";
+    if (!event->isFirstOfPost) return "not the first";
+    return event->body != nullptr ? event->body->text() : "not kept";
+  }
+  Books books_;
+  Counters counters_;
+};
+
+TEST_F(BodiesOfWatchers, ComeWithTheFirstEventThatEachIsTold) {
+  const auto all = books_.watchers()->watch({.bodies = true}),
+             ofCategory = books_.watchers()->watch({.category = 6, .bodies = true}),
+             without = books_.watchers()->watch({});
+  for (const char* body : {"[1]", "[2]"}) {
+    post(body);
+    EXPECT_EQ(bodyOf(all->next()), body);
+    EXPECT_EQ(bodyOf(all->next()), "not the first");
+    EXPECT_EQ(bodyOf(all->next()), "not the first");
+    EXPECT_EQ(bodyOf(ofCategory->next()), body);
+    EXPECT_EQ(bodyOf(ofCategory->next()), "not the first");
+    for (int i = 0; i < 3; ++i) EXPECT_EQ(bodyOf(without->next()), "not the first");
+  }
+}
+
+TEST_F(BodiesOfWatchers, AreNotKeptAwayFromOneByAnotherThatReadsNothing) {
+  const auto deaf = books_.watchers()->watch({.bodies = true}), alsoDeaf = books_.watchers()->watch({}),
+             quick = books_.watchers()->watch({.bodies = true});
+  const std::string body(Limits::maxWatchedBodyBytes, 'b');
+  for (size_t i = 0; i < 2 * Limits::maxWatchedBodies / body.size(); ++i) {
+    post(body);
+    ASSERT_EQ(bodyOf(quick->next()), body) << i;
+    for (int rest = 0; rest < 2; ++rest) ASSERT_EQ(bodyOf(quick->next()), "not the first");
+  }
+  // What it has a share for waits; of the rest the size is told.
+  size_t kept = 0, left = 0;
+  while (const auto event = deaf->next()) {
+    kept += bodyOf(event) == body ? 1 : 0;
+    left += bodyOf(event) == "not kept" ? 1 : 0;
+    if (event->isFirstOfPost) {
+      EXPECT_EQ(event->post->bodyBytes(), body.size());
+    }
+  }
+  EXPECT_GT(kept, 0U);
+  EXPECT_GT(left, 0U);
+  EXPECT_EQ(kept + left, 2 * Limits::maxWatchedBodies / body.size());
+  post(body);
+  EXPECT_EQ(bodyOf(deaf->next()), body) << "its share is free again";
+}
+
+TEST_F(BodiesOfWatchers, AreForgottenWithTheLastWhoHasThem) {
+  auto watcher = books_.watchers()->watch({.bodies = true});
+  const std::string body(Limits::maxWatchedBodyBytes, 'b');
+  for (int round = 0; round < 20; ++round) {
+    for (int i = 0; i < 10; ++i) post(body);
+    watcher.reset();
+    watcher = books_.watchers()->watch({.bodies = true});
+  }
+  std::vector<std::shared_ptr<WatchedPost>> all;
+  for (size_t i = 0; i < Limits::maxWatchedBodies / body.size(); ++i) {
+    all.push_back(std::make_shared<WatchedPost>(books_.watchers()));
+    all.back()->leaves("https://a", body);
+    ASSERT_NE(all.back()->body(), nullptr) << i;
+  }
+}
+
+TEST_F(WatchersTest, OfTheGroupLeaveAPlaceToTheDaemonsOwners) {
+  std::vector<std::unique_ptr<Watcher>> all;
+  for (size_t i = 0; i < Limits::maxWatchersOfGroup; ++i) {
+    all.push_back(watchers_->watch({}, false));
+    ASSERT_NE(all.back(), nullptr);
+  }
+  EXPECT_EQ(watchers_->watch({}, false), nullptr);
+  const auto owner = watchers_->watch({}, true);
+  EXPECT_NE(owner, nullptr);
+  all.pop_back();
+  EXPECT_NE(watchers_->watch({}, false), nullptr);
 }
 
 // For the thread sanitizer too: everything that was told arrived or is counted, in each teller's order.
