@@ -264,7 +264,7 @@ int runDaemon(const DaemonOptions& options) {
   giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
-  StopSignals stopSignals;
+  StopSignals stopSignals;  // from here on a SIGHUP that comes early ends nothing
   if (stopSignals.error() != 0) {
     log.error("main: Cannot wait for signals: %s", errorText(stopSignals.error()).c_str());
     return kCouldNotStart;

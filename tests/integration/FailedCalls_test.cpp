@@ -426,5 +426,20 @@ INSTANTIATE_TEST_SUITE_P(Of, FailedCalls, ::testing::ValuesIn(kFailures), [](con
   return std::string(failure.param.name) + "_" + failure.param.errorName;
 });
 
+// It hangs where it opens its settings: of all files /dev/null comes before, for what is closed of the first three.
+TEST(StartOfTheDaemon, IsNotCutOffByASignalToReadTheSettingsAgain) {
+  FailingDaemon daemon("http://127.0.0.1:9");
+  daemon.fail(kyt_failing_open, kyt_failing_hangs, 2);
+  daemon.start();
+  ASSERT_TRUE(eventually([&] { return daemon.failures() == 1; }));
+  daemon.terminate(SIGHUP);
+  daemon.goOn();
+  EXPECT_TRUE(
+      eventually([&] { return daemon.logged("reload: no setting has changed") || daemon.hasEnded(); }));
+  ASSERT_FALSE(daemon.hasEnded()) << daemon.log();
+  daemon.terminate();
+  EXPECT_EQ(daemon.exitStatus(), 0) << daemon.log();
+}
+
 }  // namespace
 }  // namespace kyt
