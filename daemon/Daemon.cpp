@@ -1,9 +1,13 @@
 #include "daemon/Daemon.h"
 
+#include <algorithm>
+#include <chrono>
 #include <cmath>
 #include <csignal>
 #include <cstdlib>
 #include <memory>
+#include <optional>
+#include <thread>
 #include <utility>
 #include <variant>
 
@@ -161,6 +165,27 @@ std::unique_ptr<UnixSocketAcceptor> administrationSocket(const Paths& paths,
   return std::move(std::get<std::unique_ptr<UnixSocketAcceptor>>(made));
 }
 
+// Waits until nobody erases what the daemon knows; whoever will keeps the lock meanwhile, as the daemon does while it runs.
+// False: an erasure goes on.
+bool waitForErasure(const std::string& folder, ErasureMark& mark, std::optional<DaemonLock>& lock, Log& log) {
+  constexpr std::chrono::milliseconds kPause{5};
+  const MonotonicTime end = std::chrono::steady_clock::now() + kErasurePatience;
+  for (;;) {
+    std::string problem;
+    const Duration left =
+        std::max(end - std::chrono::steady_clock::now(), std::chrono::steady_clock::duration(0));
+    lock = DaemonLock::take(folder, left, problem);
+    if (!mark.isHeld()) {
+      if (!lock) log.error("main: Cannot keep others from erasing: %s", problem.c_str());
+      static_cast<void>(mark.remove());  // of an erasure that was cut off
+      return true;
+    }
+    lock.reset();  // it was taken first, and is the eraser's
+    if (std::chrono::steady_clock::now() >= end) return false;
+    std::this_thread::sleep_for(kPause);
+  }
+}
+
 struct Configured {
   Settings& settings;
   const Paths& paths;
@@ -190,12 +215,12 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
     log.error("main: Cannot start the reactor");
     return kCouldNotStart;
   }
-  // Whoever erases what the daemon knows keeps it meanwhile.
-  std::string problem;
-  const auto lock = DaemonLock::take(paths.userDefaults(), kErasurePatience, problem);
-  if (!lock) log.error("main: Cannot keep others from erasing: %s", problem.c_str());
   ErasureMark mark(paths.userDefaults());
-  static_cast<void>(mark.remove());  // of an erasure that was cut off
+  std::optional<DaemonLock> lock;
+  if (!waitForErasure(paths.userDefaults(), mark, lock, log)) {
+    log.error("main: The owner still erases what is known: not starting");
+    return kCouldNotStart;
+  }
   log.allowThreads();
   DaemonServices services({.system = {.settings = settings,
                                       .paths = paths,
@@ -240,6 +265,7 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
 
 int runDaemon(const DaemonOptions& options) {
   fillStandardDescriptors();
+  StopSignals stopSignals;  // from here on a SIGHUP that comes early ends nothing
   StderrSink standardError;
   Log log(standardError, options.logLevel.value_or(LogLevel::normal));
   const Paths paths = Paths::of(absolutePath(options.root), executableFolder());
@@ -264,7 +290,6 @@ int runDaemon(const DaemonOptions& options) {
   giveLargeBlocksBack();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
-  StopSignals stopSignals;  // from here on a SIGHUP that comes early ends nothing
   if (stopSignals.error() != 0) {
     log.error("main: Cannot wait for signals: %s", errorText(stopSignals.error()).c_str());
     return kCouldNotStart;

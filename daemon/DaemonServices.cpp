@@ -207,9 +207,16 @@ bool DaemonServices::shutDown() {
 }
 
 // The threads are not even asked to end: on their way they would send. Clients see their connection end, as when a daemon is
-// killed.
+// killed. What left is written down, and what is on its way is cut off and may have left: whoever erases asks that file whom
+// to name.
 void DaemonServices::endWithoutSending() {
+  if (system_.outbox) system_.outbox->outbox().stopSending();
+  system_.urlSessions.cancelAll();
+  const Deadline deadline(system_.clock, 0);
+  static_cast<void>(
+      deadline.waitUntil([this] { return system_.urlSessions.outstanding() == 0; }, kCancelGrace));
   logFigures();
+  system_.departures.flush();
   std::_Exit(0);
 }
 

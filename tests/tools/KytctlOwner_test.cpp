@@ -2,15 +2,22 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
+#include <optional>
+#include <set>
 #include <sstream>
 #include <string>
+#include <utility>
 
 #include "platform/linux/data/RapidJSON.h"
+#include "platform/linux/device/DepartureFile.h"
 #include "tests/integration/StageFixture.h"
 #include "tests/support/Eventually.h"
 
@@ -152,6 +159,7 @@ TEST_F(KytctlOwner, IsToldThatADaemonDoesNotSayWhatWaits) {
   // It opens a moment after the other one.
   const std::string window = stage_->folder() + "/run/kytreportingd/admin";
   ASSERT_TRUE(eventually([&window] { return std::filesystem::remove(window); }));
+  ASSERT_TRUE(eventually([&] { return DaemonLock::holder(state("")) > 0; })) << "it is seen to run";
   const Dictionary waiting = *shown().dictionary("waiting");
   ASSERT_NE(waiting.string("problem"), nullptr) << description(waiting);
   EXPECT_TRUE(has(waiting.string("problem")->str(), "has no administration socket")) << description(waiting);
@@ -276,6 +284,9 @@ TEST_F(KytctlOwner, ErasesBesideADaemonWhichSendsNothingMoreAndWritesNothingBack
   const ProgramRun run = kytctl({"owner", "erase"});
   EXPECT_EQ(run.status, 0) << run.text << daemonLog();
   EXPECT_TRUE(has(run.text, "what waited in its memory was not sent")) << run.text;
+  EXPECT_TRUE(has(run.text, "  server     " + stage_->httpsBase() + "\n"))
+      << "also of the last moments, which the daemon had not written down\n"
+      << run.text;
   EXPECT_TRUE(logged("main: The owner erases what is known: what waits is not sent"));
   EXPECT_EQ(arrived("client=other&method=5"), 0);
   for (const char* file : {"departures.json", "erase"})
@@ -288,6 +299,125 @@ TEST_F(KytctlOwner, ErasesBesideADaemonWhichSendsNothingMoreAndWritesNothingBack
   const std::string after = identifierIn(shown());
   EXPECT_NE(after, "");
   EXPECT_NE(after, before);
+}
+
+TEST_F(KytctlOwner, NamesTheServerOfAPostThatWasOnItsWayWhenItErased) {
+  start();
+  TestClient client(socket(), 8, "person");
+  ASSERT_EQ(client.configure(), "live: httppost");
+  ASSERT_TRUE(stage_->control("/control/reply", R"({"path":"/events","hang":true,"times":0})"))
+      << "nothing is answered";
+  ASSERT_TRUE(client.send(3, 1, {}));
+  ASSERT_TRUE(client.finish());
+  ASSERT_TRUE(eventually([&] {
+    return has(kytctl({"books", "--json"}).text, "\"inFlight\":1");
+  })) << kytctl({"books"}).text;
+  const ProgramRun run = kytctl({"owner", "erase"});
+  EXPECT_EQ(run.status, 0) << run.text << daemonLog();
+  EXPECT_TRUE(has(run.text, "  server     " + stage_->httpsBase() + "\n")) << run.text;
+  client.close();
+  end();
+}
+
+// A process that stands for an eraser or a daemon, until it is killed.
+class StandIn {
+ public:
+  explicit StandIn(const std::function<bool()>& begin) {
+    int ready[2];
+    EXPECT_EQ(pipe(ready), 0);
+    process_ = fork();
+    if (process_ == 0) {
+      const char byte = begin() ? 'y' : 'n';
+      if (write(ready[1], &byte, 1) != 1) _exit(1);
+      for (;;) pause();
+    }
+    char byte = 0;
+    EXPECT_EQ(read(ready[0], &byte, 1), 1);
+    EXPECT_EQ(byte, 'y');
+    close(ready[0]);
+    close(ready[1]);
+  }
+  ~StandIn() { end(); }
+  void end() {
+    if (process_ == 0) return;
+    kill(process_, SIGKILL);
+    waitpid(std::exchange(process_, 0), nullptr, 0);
+  }
+
+ private:
+  pid_t process_ = 0;
+};
+
+TEST_F(KytctlOwner, KeepsADaemonFromStartingWhileItErases) {
+  start();
+  end();
+  StandIn eraser([this] {
+    static ErasureMark mark(state(""));
+    return mark.set();
+  });
+  startDaemon();
+  EXPECT_EQ(stage_->daemon()->wait(std::chrono::seconds(30)).value_or(-1), 1) << daemonLog();
+  EXPECT_TRUE(logged("main: The owner still erases what is known: not starting")) << daemonLog();
+  EXPECT_EQ(access(state("erase").c_str(), F_OK), 0) << "the eraser's mark";
+  startDaemon();
+  eraser.end();
+  report("person", 1);
+  EXPECT_NE(access(state("erase").c_str(), F_OK), 0) << "it was left behind";
+}
+
+TEST_F(KytctlOwner, ErasesAMessageLogThatTheDaemonBeganMeanwhile) {
+  start();
+  end();
+  StandIn daemon([this] {
+    signal(SIGTERM, SIG_IGN);
+    static std::optional<DaemonLock> lock;
+    std::string problem;
+    lock = DaemonLock::take(state(""), std::chrono::seconds(10), problem);
+    return lock.has_value();
+  });
+  ASSERT_EQ(messageLogs(), 0U);
+  tools::ChildProcess::Options how;
+  how.outputFile = stage_->folder() + "/erased";
+  auto erasing = tools::ChildProcess::start(stage_->program("kytctl"),
+                                            {"--root", stage_->folder(), "owner", "erase"}, how);
+  ASSERT_TRUE(erasing);
+  ASSERT_TRUE(eventually([&] { return access(state("erase").c_str(), F_OK) == 0; }));
+  const std::string logs = stage_->folder() + "/var/mobile/Library/Logs/Faultbin/Retired";
+  std::filesystem::create_directories(logs);
+  std::ofstream(logs + "/kytreportingd_2026-11-22-190000_messageLog.diag") << "what was answered";
+  ASSERT_EQ(messageLogs(), 1U);
+  daemon.end();
+  EXPECT_EQ(erasing->wait(std::chrono::seconds(30)).value_or(-1), 0) << contents(how.outputFile);
+  EXPECT_EQ(messageLogs(), 0U);
+  EXPECT_TRUE(has(contents(how.outputFile), ", 1 message logs, ")) << contents(how.outputFile);
+}
+
+TEST_F(KytctlOwner, SeesProgramsInColumnsWhateverLettersTheirNamesHave) {
+  lay();
+  putBag("dulvek", {entry("p\u00e9rs\u00f6n"), entry("person")});
+  ASSERT_EQ(kytctl({"consent", "grant"}).status, 0);
+  startDaemon();
+  report("person", 1);
+  TestClient client(socket(), 8, "p\u00e9rs\u00f6n");
+  ASSERT_EQ(client.configure(), "live: httppost");
+  ASSERT_TRUE(client.send(4, 1, {}));
+  ASSERT_TRUE(client.finish());
+  ASSERT_TRUE(arrive("method=4", 1));
+  end();
+  const std::string text = kytctl({"owner", "show"}).text;
+  // Both columns begin at the same character.
+  std::set<size_t> places;
+  std::istringstream lines(text);
+  for (std::string line; std::getline(lines, line);) {
+    const size_t server = line.find("https://");
+    if (server == line.npos) continue;
+    const std::string before = line.substr(0, server);
+    places.insert(static_cast<size_t>(std::count_if(before.begin(), before.end(), [](char c) {
+      return (static_cast<unsigned char>(c) & 0xC0) != 0x80;
+    })));
+  }
+  EXPECT_EQ(places.size(), 1U) << text;
+  EXPECT_TRUE(has(text, "p\u00e9rs\u00f6n ")) << text;
 }
 
 TEST_F(KytctlOwner, ErasesNothingWhereItCannotWrite) {

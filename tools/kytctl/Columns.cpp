@@ -12,11 +12,6 @@ namespace kyt::tools {
 
 namespace {
 
-size_t characters(std::string_view text) {
-  return static_cast<size_t>(std::count_if(
-      text.begin(), text.end(), [](char c) { return (static_cast<unsigned char>(c) & 0xC0) != 0x80; }));
-}
-
 std::tm localTime(int64_t seconds) {
   const std::time_t time = seconds;
   std::tm local{};
@@ -26,9 +21,14 @@ std::tm localTime(int64_t seconds) {
 
 }  // namespace
 
+size_t charactersIn(std::string_view text) {
+  return static_cast<size_t>(std::count_if(
+      text.begin(), text.end(), [](char c) { return (static_cast<unsigned char>(c) & 0xC0) != 0x80; }));
+}
+
 std::string cutText(std::string_view text, size_t most) {
   std::string shown = escapedText(text);
-  if (characters(shown) <= most) return shown;
+  if (charactersIn(shown) <= most) return shown;
   size_t end = 0, count = 0;
   while (end < shown.size() && count + 1 < most) {
     end += std::max<size_t>(utf8SequenceLength(std::string_view(shown).substr(end)), 1);
@@ -52,8 +52,8 @@ void Columns::addNote(std::string_view text) {
 std::string Columns::text() const {
   std::vector<size_t> widths;
   for (size_t i = 0; i < columns_.size(); ++i) {
-    size_t width = characters(columns_[i].title);
-    for (const auto& row : rows_) width = std::max(width, characters(row[i]));
+    size_t width = charactersIn(columns_[i].title);
+    for (const auto& row : rows_) width = std::max(width, charactersIn(row[i]));
     widths.push_back(width);
   }
   std::string text;
@@ -61,7 +61,7 @@ std::string Columns::text() const {
     std::string out;
     for (size_t i = 0; i < columns_.size(); ++i) {
       const std::string cell = textOf(i);
-      const std::string padding(widths[i] - characters(cell), ' ');
+      const std::string padding(widths[i] - charactersIn(cell), ' ');
       out += (i == 0 ? "" : "  ") + (columns_[i].right ? padding + cell : cell + padding);
     }
     while (!out.empty() && out.back() == ' ') out.pop_back();

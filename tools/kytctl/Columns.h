@@ -33,6 +33,7 @@ class Columns {
   std::vector<std::string> notes_;  // beneath each row: whole lines
 };
 
+[[nodiscard]] size_t charactersIn(std::string_view text);
 // Escaped, and cut to so many characters.
 [[nodiscard]] std::string cutText(std::string_view text, size_t most);
 // "12:03:59" today, otherwise "2026-11-22 12:03", by the local clock; "never" for 0.

@@ -1,5 +1,4 @@
 // What the owner of the device sees of what leaves it, takes along, and erases.
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -25,6 +24,7 @@
 #include "platform/linux/files/Files.h"
 #include "platform/queues/Log.h"
 #include "tools/StorebagFile.h"
+#include "tools/kytctl/Columns.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/WaitingEvents.h"
 #include "tools/kytctl/WaitingPosts.h"
@@ -68,17 +68,10 @@ std::string sizeText(uint64_t bytes) {
   return shown;
 }
 
+// Cut and padded to so many characters.
 std::string fitted(std::string_view given, size_t width) {
-  std::string text = escapedText(given);
-  if (text.empty()) text = "-";
-  if (text.size() > width) {
-    text.resize(width - 1);
-    while (!text.empty() && (static_cast<unsigned char>(text.back()) & 0xC0) == 0x80) text.pop_back();
-    if (!text.empty() && static_cast<unsigned char>(text.back()) >= 0xC0) text.pop_back();
-    text += '~';
-  }
-  text.resize(std::max(text.size(), width), ' ');
-  return text;
+  const std::string text = cutText(given.empty() ? "-" : given, width);
+  return text + std::string(width - charactersIn(text), ' ');
 }
 
 // All that is on the device of what the daemon did.
@@ -157,7 +150,7 @@ class Owner {
       std::printf("Nothing to erase: no daemon ever ran here\n");
       return 0;
     }
-    const ErasureMark mark(paths_.userDefaults());
+    ErasureMark mark(paths_.userDefaults());
     if (!mark.set()) return failedAt(mark.path());
     const int status = eraseWithMark();
     return mark.remove() ? status : failedAt(mark.path());
@@ -280,16 +273,16 @@ class Owner {
 
   // The lock is kept meanwhile: a daemon that starts waits for it, and finds nothing of before.
   [[nodiscard]] int eraseWithMark() {
-    const pid_t daemon = DaemonLock::holder(paths_.userDefaults());
-    if (daemon > 0 && ::kill(daemon, SIGTERM) != 0 && errno != ESRCH)
-      return failed("the daemon, process " + std::to_string(daemon) + ": " + errorText(errno));
     std::string problem;
-    const auto lock = DaemonLock::take(paths_.userDefaults(), kDaemonEnds, problem);
+    int ended = 0;
+    const auto lock = DaemonLock::takeFromDaemon(paths_.userDefaults(), kDaemonEnds, problem, ended);
     if (!lock) return failed("the daemon has not ended, and nothing was erased: " + problem);
     // What it wrote until then counts.
     table_ = DepartureFile::read(paths_.userDefaults(), json_);
     identifiers_.clear();
     findIdentifiers();
+    logs_.clear();
+    findLogs();
     if (!isWhole()) return 1;
     if (const auto error = defaults_.removeIdentifiers(kKYTReportingDefaultsDomain)) return failed(*error);
     int status = 0;
@@ -308,7 +301,7 @@ class Owner {
     if (wasKept) std::printf("Erased: what could not be sent\n");
     const std::string file = DepartureFile::pathIn(paths_.userDefaults());
     if (::unlink(file.c_str()) != 0 && errno != ENOENT) status = failedAt(file);
-    if (status == 0) tellErased(daemon > 0);
+    if (status == 0) tellErased(ended > 0);
     return status;
   }
 

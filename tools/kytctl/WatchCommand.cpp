@@ -19,12 +19,6 @@ namespace {
 
 constexpr size_t kFateAt = 58;  // characters before the fate
 
-size_t charactersIn(std::string_view text) {
-  size_t count = 0;
-  for (const char c : text) count += (static_cast<unsigned char>(c) & 0xC0) != 0x80 ? 1 : 0;
-  return count;
-}
-
 std::string field(std::string_view text, size_t width, bool right = false) {
   std::string shown = cutText(text, width);
   const std::string blanks(width - charactersIn(shown), ' ');

@@ -1,10 +1,13 @@
 #include "platform/linux/device/DepartureFile.h"
 
 #include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <chrono>
+#include <set>
 #include <thread>
 #include <utility>
 #include <variant>
@@ -26,35 +29,75 @@ struct flock wholeFile() {
   return lock;
 }
 
+constexpr std::chrono::milliseconds kPause{5};
+
+// Made by root, it must still be the daemon's to open.
+Descriptor openOrMake(const std::string& path) {
+  Descriptor file = ownDescriptor(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
+  if (!file) return file;
+  struct stat above = {}, own = {};
+  const std::string folder = path.substr(0, path.rfind('/'));
+  if (::stat(folder.c_str(), &above) == 0 && ::fstat(file.get(), &own) == 0 && own.st_uid != above.st_uid &&
+      ::fchown(file.get(), above.st_uid, above.st_gid) != 0)
+    errno = 0;
+  return file;
+}
+
+// False: errno says why, EAGAIN or EACCES where another process has locked it.
+bool lockWhole(const Descriptor& file) {
+  struct flock lock = wholeFile();
+  return ::fcntl(file.get(), F_SETLK, &lock) == 0;
+}
+
+bool isAt(const Descriptor& file, const std::string& path) {
+  struct stat own = {}, there = {};
+  return ::fstat(file.get(), &own) == 0 && ::stat(path.c_str(), &there) == 0 && own.st_dev == there.st_dev &&
+         own.st_ino == there.st_ino;
+}
+
 std::string problemWith(const std::string& path) {
   return path + ": " + errorText(errno);
 }
 
 }  // namespace
 
-std::optional<DaemonLock> DaemonLock::take(const std::string& folder, Duration patience,
-                                           std::string& problem) {
+std::optional<DaemonLock> DaemonLock::take(const std::string& folder, Duration patience, std::string& problem,
+                                           const std::function<bool()>& meanwhile) {
   const std::string path = lockIn(folder);
-  Descriptor file = ownDescriptor(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
+  Descriptor file = openOrMake(path);
   if (!file) {
     problem = problemWith(path);
     return std::nullopt;
   }
-  // Made by root, it must still be the daemon's to open.
-  struct stat above = {}, own = {};
-  if (::stat(folder.c_str(), &above) == 0 && ::fstat(file.get(), &own) == 0 && own.st_uid != above.st_uid &&
-      ::fchown(file.get(), above.st_uid, above.st_gid) != 0)
-    errno = 0;
   const MonotonicTime end = std::chrono::steady_clock::now() + patience;
-  struct flock lock = wholeFile();
-  while (::fcntl(file.get(), F_SETLK, &lock) != 0) {
-    if ((errno != EAGAIN && errno != EACCES) || std::chrono::steady_clock::now() >= end) {
+  while (!lockWhole(file)) {
+    const bool isKept = errno == EAGAIN || errno == EACCES;
+    if (!isKept || std::chrono::steady_clock::now() >= end || (meanwhile && !meanwhile())) {
       problem = problemWith(path);
       return std::nullopt;
     }
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    std::this_thread::sleep_for(kPause);
   }
   return DaemonLock(std::move(file));
+}
+
+std::optional<DaemonLock> DaemonLock::take(const std::string& folder, Duration patience,
+                                           std::string& problem) {
+  return take(folder, patience, problem, nullptr);
+}
+
+std::optional<DaemonLock> DaemonLock::takeFromDaemon(const std::string& folder, Duration patience,
+                                                     std::string& problem, int& told) {
+  std::set<pid_t> asked;
+  return take(folder, patience, problem, [&] {
+    const pid_t keeper = holder(folder);
+    if (keeper <= 0 || !asked.insert(keeper).second) return true;
+    if (::kill(keeper, SIGTERM) == 0)
+      ++told;
+    else if (errno != ESRCH)
+      return false;
+    return true;
+  });
 }
 
 pid_t DaemonLock::holder(const std::string& folder) {
@@ -65,11 +108,36 @@ pid_t DaemonLock::holder(const std::string& folder) {
   return lock.l_pid > 0 ? lock.l_pid : 0;
 }
 
-bool ErasureMark::set() const {
-  return ownDescriptor(::open(path_.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640)).get() >= 0;
+bool ErasureMark::isHeld() const {
+  const Descriptor file = ownDescriptor(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+  struct flock lock = wholeFile();
+  return file && ::fcntl(file.get(), F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK;
 }
 
-bool ErasureMark::remove() const {
+// What was locked may have been removed before: then it is nobody's mark.
+bool ErasureMark::set() {
+  while (!file_) {
+    Descriptor file = openOrMake(path_);
+    if (!file) return false;
+    if (!lockWhole(file)) {
+      if (errno != EAGAIN && errno != EACCES) return false;
+      std::this_thread::sleep_for(kPause);
+      continue;
+    }
+    if (!isAt(file, path_)) continue;
+    file_ = std::move(file);
+  }
+  return true;
+}
+
+bool ErasureMark::remove() {
+  Descriptor file = std::move(file_);
+  if (!file) {
+    file = ownDescriptor(::open(path_.c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
+    if (!file) return errno == ENOENT;
+    if (!lockWhole(file)) return false;
+    if (!isAt(file, path_)) return true;
+  }
   return ::unlink(path_.c_str()) == 0 || errno == ENOENT;
 }
 

@@ -9,6 +9,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -32,26 +33,39 @@ class DaemonLock {
   // Waits so long at most. None: somebody keeps it, or the system refuses it; `problem` says so.
   [[nodiscard]] static std::optional<DaemonLock> take(const std::string& folder, Duration patience,
                                                       std::string& problem);
+  // The same for whoever erases: each process that keeps it meanwhile, or takes it before, is told to end (SIGTERM), once.
+  // `told`: how many were.
+  [[nodiscard]] static std::optional<DaemonLock> takeFromDaemon(const std::string& folder, Duration patience,
+                                                                std::string& problem, int& told);
   // The process that keeps it; 0: nobody, or it cannot be seen.
   [[nodiscard]] static pid_t holder(const std::string& folder);
 
  private:
   explicit DaemonLock(Descriptor file) : file_(std::move(file)) {}
+  // `meanwhile`, which may be null, is called now and then; false: it is in vain, and errno says why.
+  [[nodiscard]] static std::optional<DaemonLock> take(const std::string& folder, Duration patience,
+                                                      std::string& problem,
+                                                      const std::function<bool()>& meanwhile);
   Descriptor file_;  // no other of that file may be open in this process: closing one would give up the lock
 };
 
-// A file that tells the daemon, when it ends, to send nothing any more: whoever erases sets it, then has the daemon end.
+// A file that tells the daemon, when it ends, to send nothing any more: whoever erases sets it, then has the daemon end. It
+// is locked while whoever set it lives, so that what was left behind is told from an erasure that goes on.
 class ErasureMark {
  public:
   explicit ErasureMark(const std::string& folder) : path_(folder + "/erase") {}
   [[nodiscard]] bool stands() const { return identityOf(path_).exists(); }
-  // False: errno says why.
-  [[nodiscard]] bool set() const;
-  [[nodiscard]] bool remove() const;  // true also where there is none
+  // Another process has set it, and lives.
+  [[nodiscard]] bool isHeld() const;
+  // Sets and holds it; where another process does, waits for that for ever. False: errno says why.
+  [[nodiscard]] bool set();
+  // One's own, or one that was left behind; true also where there is none, false where another process holds it.
+  [[nodiscard]] bool remove();
   [[nodiscard]] const std::string& path() const { return path_; }
 
  private:
   const std::string path_;
+  Descriptor file_;  // while it is held
 };
 
 class DepartureFile final : public Departures {

@@ -1,11 +1,16 @@
 // The file of what left, and the lock beside it.
 #include "platform/linux/device/DepartureFile.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <fstream>
+#include <functional>
+#include <iterator>
 #include <memory>
 #include <string>
 
@@ -14,6 +19,7 @@
 #include "platform/fake/ManualTimers.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "platform/linux/data/RapidJSON.h"
+#include "tests/support/Eventually.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
@@ -152,8 +158,100 @@ TEST_F(DepartureFileTest, NobodyHoldsALockThatIsNotThere) {
   EXPECT_EQ(problem, folder_ / "missing/daemon.lock: No such file or directory");
 }
 
+// A process that does something, says that it has, and goes on until it is told to end, or dies.
+class OtherProcess {
+ public:
+  explicit OtherProcess(const std::function<void()>& begin) {
+    int ready[2];
+    EXPECT_EQ(pipe(ready), 0);
+    process_ = fork();
+    if (process_ == 0) {
+      begin();
+      const char byte = 'y';
+      if (write(ready[1], &byte, 1) != 1) _exit(1);
+      for (;;) pause();
+    }
+    close(ready[1]);
+    ready_ = ready[0];
+  }
+  ~OtherProcess() {
+    kill(process_, SIGKILL);
+    static_cast<void>(end());
+    close(ready_);
+  }
+  bool hasBegun() const {
+    char byte = 0;
+    return read(ready_, &byte, 1) == 1;
+  }
+  // The signal that ended it.
+  int end() {
+    if (ended_ == 0) {
+      int status = 0;
+      EXPECT_EQ(waitpid(process_, &status, 0), process_);
+      ended_ = WTERMSIG(status);
+    }
+    return ended_;
+  }
+  [[nodiscard]] pid_t process() const { return process_; }
+
+ private:
+  pid_t process_ = 0;
+  int ready_ = -1, ended_ = 0;
+};
+
+TEST_F(DepartureFileTest, WhoeverErasesEndsADaemonThatStartsMeanwhileToo) {
+  const auto keep = [this] {
+    std::string problem;
+    static const auto lock = DaemonLock::take(folder_.path(), std::chrono::seconds(30), problem);
+    if (!lock) _exit(1);
+  };
+  OtherProcess first(keep);
+  ASSERT_TRUE(first.hasBegun());
+  // Stands in line before the eraser, so that it has the lock next.
+  OtherProcess second([this] {
+    const int file = open((folder_ / "daemon.lock").c_str(), O_RDWR | O_CLOEXEC);
+    struct flock lock = {};
+    lock.l_type = F_WRLCK;
+    lock.l_whence = SEEK_SET;
+    if (fcntl(file, F_SETLKW, &lock) != 0) _exit(1);
+  });
+  const std::string waiting = "-> POSIX  ADVISORY  WRITE " + std::to_string(second.process()) + " ";
+  ASSERT_TRUE(eventually([&] {
+    std::ifstream locks("/proc/locks");
+    const std::string all{std::istreambuf_iterator<char>(locks), {}};
+    return all.find(waiting) != all.npos;
+  }));
+  std::string problem;
+  int told = 0;
+  EXPECT_TRUE(DaemonLock::takeFromDaemon(folder_.path(), std::chrono::seconds(20), problem, told)) << problem;
+  EXPECT_EQ(first.end(), SIGTERM);
+  if (told == 2) {
+    EXPECT_EQ(second.end(), SIGTERM);
+  }
+  EXPECT_GE(told, 1);
+}
+
+TEST_F(DepartureFileTest, AnErasuresMarkIsKnownToBeHeldWhileItsProcessLives) {
+  ErasureMark mark(folder_.path());
+  EXPECT_FALSE(mark.isHeld());
+  {
+    OtherProcess eraser([this] {
+      static ErasureMark own(folder_.path());
+      if (!own.set()) _exit(1);
+    });
+    ASSERT_TRUE(eraser.hasBegun());
+    EXPECT_TRUE(mark.isHeld());
+    EXPECT_FALSE(mark.remove()) << "it is another's";
+    EXPECT_TRUE(mark.stands());
+  }
+  EXPECT_TRUE(mark.stands()) << "it was left behind";
+  EXPECT_FALSE(mark.isHeld());
+  EXPECT_TRUE(mark.remove());
+  EXPECT_FALSE(mark.stands());
+}
+
 TEST_F(DepartureFileTest, AnErasuresMarkStandsUntilItIsRemoved) {
-  const ErasureMark mark(folder_.path());
+  ErasureMark mark(folder_.path());
   EXPECT_FALSE(mark.stands());
   EXPECT_TRUE(mark.remove());
   EXPECT_TRUE(mark.set());
