@@ -5,15 +5,20 @@
 
 #include "platform/linux/files/Files.h"
 #include "platform/linux/toml/TomlSettings.h"
+#include "platform/linux/url/CertificateStore.h"
 
 namespace kyt {
 
 // The confinement names the folder of the certificates, once; another one is out of reach.
-bool DaemonReload::mustWait(const std::string& setting, const Settings& read) const {
-  if (setting != "tls.ca_file" || read.caFile.empty()) return false;
+std::optional<std::string> DaemonReload::hindrance(const std::string& setting, const Settings& read) const {
+  if (setting == "log.level" && parts_.commandLine) return "the command line's counts";
+  if (setting != "tls.ca_file" || read.caFile.empty()) return std::nullopt;
   const auto seen = readRegularFile(read.caFile, kMaxTomlBytes);
-  const auto* problem = std::get_if<ReadProblem>(&seen);
-  return problem != nullptr && problem->error != 0;
+  if (const auto* problem = std::get_if<ReadProblem>(&seen); problem != nullptr && problem->error != 0)
+    return "counts after a restart, the daemon that runs cannot read " + read.caFile + ": " + problem->text;
+  if (CertificateStore(read.caFile).store() == nullptr)
+    return "not taken up: " + read.caFile + " holds no certificates that can be read";
+  return std::nullopt;
 }
 
 DaemonReload::Outcome DaemonReload::reload() {
@@ -27,21 +32,20 @@ DaemonReload::Outcome DaemonReload::reload() {
     return outcome;
   }
   const Settings& settings = std::get<Settings>(read);
-  bool takesUp = false;
+  bool takesUp = false, takesUpLevel = false;
   for (const SettingChange& change : changedSettings(parts_.running, settings)) {
-    const bool isFixed = change.name == "log.level" && parts_.commandLine.has_value();
-    const bool waits = change.taking == Taking::atStart || mustWait(change.name, settings);
-    lines.push_back(change.name + (isFixed ? ": the command line's counts"
-                                   : waits ? ": counts after a restart"
-                                           : ": taken up"));
-    if (isFixed || waits) continue;
+    const auto hindered = change.taking == Taking::atStart
+                              ? std::optional<std::string>("counts after a restart")
+                              : hindrance(change.name, settings);
+    lines.push_back(change.name + ": " + hindered.value_or("taken up"));
+    if (hindered) continue;
     change.take(parts_.running, settings);
     takesUp = true;
+    takesUpLevel = takesUpLevel || change.name == "log.level";
   }
-  if (takesUp) {
-    if (!parts_.commandLine) parts_.log.setLevel(parts_.running.logLevel);
-    parts_.takeUp(parts_.running);
-  }
+  // A level that an administrator has set holds until the file's changes.
+  if (takesUpLevel) parts_.log.setLevel(parts_.running.logLevel);
+  if (takesUp) parts_.takeUp(parts_.running);
   if (lines.empty()) lines.emplace_back("no setting has changed");
   for (const std::string& line : lines) parts_.log.normal("reload: %s", line.c_str());
   return outcome;

@@ -34,11 +34,12 @@ class DaemonReload {
   DaemonReload(const DaemonReload&) = delete;
   DaemonReload& operator=(const DaemonReload&) = delete;
 
-  // "NAME: taken up", "NAME: counts after a restart". All of it stands in the log too.
+  // "NAME: taken up", "NAME: counts after a restart", "NAME: not taken up: why". All of it stands in the log too.
   Outcome reload() EXCLUDES(mutex_);
 
  private:
-  [[nodiscard]] bool mustWait(const std::string& setting, const Settings& read) const;
+  // What becomes of a setting that differs, if it is not taken up.
+  [[nodiscard]] std::optional<std::string> hindrance(const std::string& setting, const Settings& read) const;
 
   const Parts parts_;
   Mutex mutex_;

@@ -42,7 +42,7 @@ class AdministrationInterface : public ExportedObject {
   // None where no storebag of that name is in force.
   [[nodiscard]] virtual std::optional<Dictionary> storebag(std::string_view name) = 0;
   [[nodiscard]] virtual std::string metrics(size_t mostRowsOfUser) = 0;  // as of books()
-  // "debug", "default" or "error", until the daemon ends. What is wrong with it, or none.
+  // "debug", "default" or "error", until the daemon ends or takes up another of its settings. What is wrong with it, or none.
   [[nodiscard]] virtual std::optional<std::string> setLogLevel(std::string_view level) = 0;
   // From now on the peer is told of events as they pass, by the signal, on the connection's queue, until its end. Another call
   // puts another filter in place of the first. Why not, or none.

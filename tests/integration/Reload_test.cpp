@@ -1,7 +1,10 @@
 // What a daemon that runs takes up of changed settings (SIGHUP), and what `kytreportingd --check-config` says beforehand.
 #include <csignal>
 #include <filesystem>
+#include <fstream>
 #include <regex>
+#include <string>
+#include <vector>
 
 #include "tests/integration/StageFixture.h"
 
@@ -114,6 +117,61 @@ TEST_F(Reload, TakesUpTheCertificateAuthorities) {
   expectTold("tls.ca_file: taken up");
   EXPECT_EQ(send("person", 3), 0) << "another storebag, which was not asked for yet";
   EXPECT_TRUE(arrive("client=person&method=3", 1));
+}
+
+TEST_F(Reload, KeepsTheCertificateAuthoritiesWhereTheNewFileHasNone) {
+  startDaemon();
+  const std::string empty = stage_->folder() + "/server/empty.pem";
+  ASSERT_FALSE(tools::writeFile(empty, "no certificate\n", 0644));
+  const std::string good = settings_;
+  const auto use = [&](const std::string& file) {
+    settings_ = std::regex_replace(good, std::regex("ca_file = \"[^\"]+\""), "ca_file = \"" + file + "\"");
+    write("");
+    return kytctl({"reload"}).text;
+  };
+  EXPECT_EQ(use(empty), "tls.ca_file: not taken up: " + empty + " holds no certificates that can be read\n");
+  EXPECT_EQ(send("person", 3), 0);
+  EXPECT_TRUE(arrive("client=person&method=3", 1)) << "those of before hold";
+  const std::string missing = stage_->folder() + "/server/missing.pem";
+  EXPECT_EQ(use(missing), "tls.ca_file: counts after a restart, the daemon that runs cannot read " + missing +
+                              ": No such file or directory\n");
+  settings_ = good;
+  write("");
+  EXPECT_EQ(kytctl({"reload"}).text, "no setting has changed\n");
+}
+
+TEST_F(Reload, OfAnotherSettingLeavesTheLevelThatAnAdministratorHasSet) {
+  startDaemon();
+  EXPECT_EQ(kytctl({"log-level", "debug"}).text, "debug\n");
+  write("[limits]\nmax_batch_bytes = 1000\n");
+  EXPECT_EQ(kytctl({"reload"}).text, "limits.max_batch_bytes: taken up\n");
+  EXPECT_EQ(kytctl({"log-level"}).text, "debug\n");
+  settings_ = std::regex_replace(settings_, std::regex("\\[log\\]\n"), "[log]\nlevel = \"error\"\n");
+  write("[limits]\nmax_batch_bytes = 1000\n");
+  EXPECT_EQ(kytctl({"reload"}).text, "log.level: taken up\n");
+  EXPECT_EQ(kytctl({"log-level"}).text, "error\n");
+}
+
+// What the unit's ExecReload does, without a service manager: its lines as they stand, with the process that it would name.
+TEST_F(Reload, IsDoneByTheCommandsOfTheUnit) {
+  startDaemon();
+  std::ifstream unit(std::string(KYT_UNITS) + "/kytreportingd.service.in");
+  std::vector<std::string> commands;
+  for (std::string line; std::getline(unit, line);)
+    if (line.starts_with("ExecReload=")) commands.push_back(line.substr(line.find('=') + 1));
+  ASSERT_EQ(commands.size(), 2U);
+  // The manager puts its variables in before a shell sees them; the daemon of this test has another root.
+  const auto run = [&](std::string command) {
+    command = std::regex_replace(command, std::regex("@KYT_PROGRAMS@/kytreportingd"),
+                                 stage_->program("kytreportingd") + " --root " + stage_->folder());
+    command = std::regex_replace(command, std::regex("\\$MAINPID"), std::to_string(stage_->daemon()->pid()));
+    return runProgram("/bin/sh", {"-c", command}).status;
+  };
+  write("[limits]\nmax_batch_bytes = 1000\n");
+  for (const std::string& command : commands) ASSERT_EQ(run(command), 0) << command;
+  expectTold("limits.max_batch_bytes: taken up");
+  write("[limits]\nmax_batch_byte = 1\n");
+  EXPECT_NE(run(commands[0]), 0) << "a wrong file keeps the manager from the second";
 }
 
 TEST_F(Reload, TellsWhatWantsARestart) {
