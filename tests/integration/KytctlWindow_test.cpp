@@ -118,7 +118,8 @@ TEST_F(KytctlWindow, TellsHowTheDaemonStandsInBothForms) {
 
   const std::string shown = columns({"status"});
   for (const char* line :
-       {"\nclients        1 session, 1 connection\n", "\nlast hour      1 delivered, 0 dropped (0.0 %)\n",
+       {"\nclients        1 session, 1 connection\n", "\nworking        yes, 1 left in the last hour\n",
+        "\nlast hour      1 delivered, 0 dropped (0.0 %)\n",
         "\nall            1 delivered, 0 dropped (0.0 %), 1 pending of 2 taken\n",
         "\nback ends      QH httppost enabled, in 1 session\n", "storebags      cadmor version 1 in force"})
     EXPECT_NE(shown.find(line), std::string::npos) << shown;
@@ -159,6 +160,21 @@ TEST_F(KytctlWindow, TellsHowTheDaemonStandsInBothForms) {
   EXPECT_EQ(text(json({"metrics"}), "openmetrics").substr(0, 7), "# HELP ");
 }
 
+TEST_F(KytctlWindow, TellsThatNothingWasToBeSentAndThatEventsWait) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  EXPECT_NE(columns({"status"}).find("\nworking        nothing was to be sent in the last hour\n"),
+            std::string::npos);
+  TestClient client(socket(), 7, "a");
+  ASSERT_EQ(client.configure(), "live: httppost") << daemonLog();
+  EXPECT_TRUE(client.send(6, 1, Dictionary{{"a", 1}}));
+  EXPECT_EQ(client.displayURL(), "https://display.example.org/");
+  EXPECT_NE(columns({"status"}).find("\nworking        nothing left in the last hour, 1 pending\n"),
+            std::string::npos)
+      << columns({"status"});
+}
+
 TEST_F(KytctlWindow, TellsWhatIsLostAndWhichRuleKeepsABackEndOff) {
   lay();
   putBag("cadmor", {entry("a"), entry("broken", "/no-such-path")});
@@ -172,6 +188,9 @@ TEST_F(KytctlWindow, TellsWhatIsLostAndWhichRuleKeepsABackEndOff) {
   EXPECT_TRUE(broken.send(5, 1, {}));
   EXPECT_EQ(broken.flush(), "flushed");
   const std::string shown = columns({"status"});
+  EXPECT_NE(shown.find("\nworking        no, nothing left in the last hour, and 2 did not: most for "),
+            std::string::npos)
+      << shown;
   EXPECT_NE(shown.find("QH httppost disabled by client, in 1 session"), std::string::npos) << shown;
   EXPECT_NE(shown.find(" 1 event-dropped-by-state\n"), std::string::npos) << shown;
   EXPECT_NE(shown.find(" 1 post-refused\n"), std::string::npos) << shown;

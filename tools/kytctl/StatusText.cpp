@@ -50,6 +50,17 @@ void addFates(std::string& out, const std::string& label, const Dictionary& fate
               percent(dropped, delivered + dropped) + more);
 }
 
+// Whether it works, as far as the last hour says.
+std::string verdict(const Dictionary& lastHour, int64_t pending) {
+  const int64_t delivered = numberIn(lastHour, "delivered"), dropped = numberIn(lastHour, "dropped");
+  if (delivered > 0) return "yes, " + std::to_string(delivered) + " left in the last hour";
+  if (dropped == 0 && pending == 0) return "nothing was to be sent in the last hour";
+  if (dropped == 0) return "nothing left in the last hour, " + std::to_string(pending) + " pending";
+  const auto reasons = reasonsOf(lastHour);
+  return "no, nothing left in the last hour, and " + std::to_string(dropped) + " did not" +
+         (reasons.empty() ? "" : ": most for " + reasons.front().first);
+}
+
 void addReasons(std::string& out, const Dictionary& fates) {
   size_t shown = 0;
   for (const auto& [reason, events] : reasonsOf(fates)) {
@@ -134,6 +145,7 @@ std::string statusText(const Dictionary& status, const std::vector<Dictionary>& 
           countText(numberIn(status, "sessions"), "session") + ", " +
               countText(numberIn(status, "connections"), "connection"));
   if (const Dictionary* lastHour = status.dictionary("lastHour")) {
+    addLine(out, "working", verdict(*lastHour, numberIn(status, "pending")));
     addFates(out, "last hour", *lastHour, "");
     addReasons(out, *lastHour);
   }
