@@ -1,5 +1,6 @@
 // The receiver's processor time for a post beside a program's that only reads, hashes and publishes it (ReceiverFloor.cpp),
-// with the same server of the log, in the same run; and that of one, two and four receivers.
+// with the same server of the log, in the same run, both as fast as they take posts; and that of one, two and four receivers
+// of which each has devices of its own that post at the same rate.
 //
 //   kyt_bench_receiver PROGRAMS [POSTS]
 #include <fcntl.h>
@@ -27,8 +28,10 @@
 namespace kyt::receiver {
 namespace {
 
-constexpr size_t kBodyBytes = 7500;  // of a batch of 100 events, compressed
-constexpr unsigned kDevices = 32;
+constexpr size_t kBodyBytes = 7500;   // of a batch of 100 events, compressed
+constexpr unsigned kDevices = 32;     // … that post one after another
+constexpr unsigned kDevicesEach = 8;  // of each receiver, that post 250 times a second
+constexpr std::chrono::microseconds kPeriod(4000);
 
 // User and system time of the process, in microseconds.
 double processorTime(int pid) {
@@ -50,18 +53,22 @@ struct Outcome {
   uint64_t failed = 0;
 };
 
-// So many posts, by devices that wait for each answer, to these ports in turn.
-Outcome post(const std::vector<uint16_t>& ports, uint64_t posts) {
+// So many posts, by devices that wait for each answer, to these ports in turn; a device posts once in each period.
+Outcome post(const std::vector<uint16_t>& ports, uint64_t posts, unsigned count,
+             std::chrono::microseconds period) {
   std::atomic<uint64_t> next{0}, failed{0};
-  std::vector<std::vector<double>> times(kDevices);
+  std::vector<std::vector<double>> times(count);
   std::vector<std::thread> devices;
   const auto begin = std::chrono::steady_clock::now();
-  for (unsigned device = 0; device < kDevices; ++device)
+  for (unsigned device = 0; device < count; ++device)
     devices.emplace_back([&, device] {
       HttpConnection connection(ports[device % ports.size()]);
       std::mt19937_64 random(std::random_device{}());
       std::string body = "\x1f\x8b\x08" + std::string(kBodyBytes, 'x');
+      auto due = begin + period * device / count;
       while (next++ < posts) {
+        std::this_thread::sleep_until(due);
+        due += period;
         for (size_t i = 3; i + 8 <= body.size(); i += 8) {
           const uint64_t noise = random();
           body.replace(i, 8, reinterpret_cast<const char*>(&noise), 8);
@@ -133,9 +140,15 @@ int run(const std::string& programs, uint64_t posts) {
   const auto floorPort = static_cast<uint16_t>(std::atoi(text));
   for (int round = 0; round < 3; ++round) {
     double before = processorTime(pid);
-    const Outcome bare = post({floorPort}, posts);
+    const Outcome bare = post({floorPort}, posts, kDevices, {});
     tell("floor", bare, processorTime(pid) - before, posts);
-    for (size_t count : {1, 2, 4}) {
+    before = processorTime(pid);
+    const Outcome slow = post({floorPort}, posts, kDevicesEach, kPeriod);
+    tell("floor at 2000 posts/s", slow, processorTime(pid) - before, posts);
+    before = processorTime(receivers[0]->pid());
+    const Outcome one = post({receivers[0]->port()}, posts, kDevices, {});
+    tell("1 receiver", one, processorTime(receivers[0]->pid()) - before, posts);
+    for (const unsigned count : {1u, 2u, 4u}) {
       std::vector<uint16_t> ports;
       before = 0;
       double after = 0;
@@ -143,9 +156,9 @@ int run(const std::string& programs, uint64_t posts) {
         ports.push_back(receivers[i]->port());
         before += processorTime(receivers[i]->pid());
       }
-      const Outcome outcome = post(ports, posts);
+      const Outcome outcome = post(ports, posts, kDevicesEach * count, kPeriod);
       for (size_t i = 0; i < count; ++i) after += processorTime(receivers[i]->pid());
-      tell((std::to_string(count) + " receivers").c_str(), outcome, after - before, posts);
+      tell((std::to_string(count) + " at 2000 posts/s each").c_str(), outcome, after - before, posts);
     }
     static_cast<void>(view.purge());
   }

@@ -74,6 +74,8 @@ natsStatus NatsLog::makeOptions(Owned<natsOptions>& options) {
   then(natsOptions_SetPingInterval(made, 1000));
   then(natsOptions_SetMaxPingsOut(made, 2));
   then(natsOptions_SetWriteDeadline(made, kWriteMilliseconds));
+  // The library would collect messages for a millisecond; that is most of what a device waits for.
+  then(natsOptions_SetSendAsap(made, true));
   then(natsOptions_SetDisconnectedCB(made, &NatsLog::onDown, this));
   then(natsOptions_SetReconnectedCB(made, &NatsLog::onUp, this));
   then(natsOptions_SetClosedCB(made, &NatsLog::onClosed, this));
