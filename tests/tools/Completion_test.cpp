@@ -22,7 +22,7 @@ printf '%s\n' "${COMPREPLY[@]}"
 )";
 
 constexpr const char* kPrograms[] = {
-    "kytctl",  "kytreportingd",   "kytreceiver",       "kytdevserver",    "kytfeed",
+    "kytctl",  "kytreportingd",   "kytreader",         "kytreceiver",     "kytdevserver",       "kytfeed",
     "kytdemo", "kytsource-units", "kytsource-crashes", "kytsource-boots", "kytsource-resources"};
 
 class Shell {

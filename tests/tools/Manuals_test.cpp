@@ -56,9 +56,10 @@ TEST_P(ManualOf, NamesTheProgramsOptionsAndNoOthers) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Programs, ManualOf,
-                         ::testing::Values("kytreportingd.8", "kytreceiver.8", "kytdevserver.1", "kytfeed.1",
-                                           "kytdemo.1", "kytsource-units.8", "kytsource-boots.8",
-                                           "kytsource-crashes.8", "kytsource-resources.8"),
+                         ::testing::Values("kytreportingd.8", "kytreader.8", "kytreceiver.8",
+                                           "kytdevserver.1", "kytfeed.1", "kytdemo.1", "kytsource-units.8",
+                                           "kytsource-boots.8", "kytsource-crashes.8",
+                                           "kytsource-resources.8"),
                          [](const auto& test) {
                            std::string page = test.param;
                            page = page.substr(0, page.find('.'));
