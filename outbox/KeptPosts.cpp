@@ -195,6 +195,17 @@ uint64_t KeptPosts::bytesOfUser(uint32_t user) const {
   return known != users_.end() ? known->second.bytes : 0;
 }
 
+size_t KeptPosts::postsOfUser(uint32_t user) const {
+  const auto known = users_.find(user);
+  return known != users_.end() ? known->second.posts : 0;
+}
+
+std::vector<uint32_t> KeptPosts::users() const {
+  std::vector<uint32_t> users;
+  for (const auto& [user, share] : users_) users.push_back(user);
+  return users;
+}
+
 ServerLine* KeptPosts::line(const std::string& server) {
   const auto known = lines_.find(server);
   return known != lines_.end() ? &known->second : nullptr;

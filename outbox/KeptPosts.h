@@ -104,6 +104,8 @@ class KeptPosts {
   [[nodiscard]] size_t size() const { return size_; }
   [[nodiscard]] uint64_t bytes() const { return bytes_; }
   [[nodiscard]] uint64_t bytesOfUser(uint32_t user) const;
+  [[nodiscard]] size_t postsOfUser(uint32_t user) const;
+  [[nodiscard]] std::vector<uint32_t> users() const;
   [[nodiscard]] size_t byConsent() const { return byConsent_; }
   [[nodiscard]] ServerLine* line(const std::string& server);  // null: none
   [[nodiscard]] std::map<std::string, ServerLine>& lines() { return lines_; }

@@ -222,6 +222,7 @@ uint64_t Outbox::drop(Filter filter) {
   return queue_->sync([&]() -> uint64_t {
     queue_->assertCurrent();
     uint64_t dropped = 0;
+    if (!isLoaded_) load();
     for (KeptPosts::Entry& entry : posts_.entries()) {
       const bool isMeant = !entry.isGone && (!filter.user || *filter.user == entry.user) &&
                            (!filter.server || *filter.server == entry.line->server);
@@ -239,7 +240,8 @@ uint64_t Outbox::drop(Filter filter) {
 // disk already.
 bool Outbox::makeRoom(Plan& plan, uint32_t user, uint64_t bytes) {
   for (;;) {
-    const bool isShareFull = posts_.bytesOfUser(user) + bytes > settings_.maxBytesPerUser;
+    const bool isShareFull = posts_.bytesOfUser(user) + bytes > settings_.maxBytesPerUser ||
+                             posts_.postsOfUser(user) >= Limits::maxOutboxPostsOfAUser;
     const bool isFull =
         posts_.bytes() + bytes > settings_.maxBytes || posts_.size() >= Limits::maxOutboxPosts;
     if (!isShareFull && !isFull) return true;
@@ -248,6 +250,15 @@ bool Outbox::makeRoom(Plan& plan, uint32_t user, uint64_t bytes) {
     plan.displaced.emplace_back(oldest->number, eventsOf(*oldest));
     posts_.remove(*oldest);
   }
+}
+
+// The settings may allow less than what was kept by them.
+void Outbox::keepBounds() {
+  Plan plan;
+  for (const uint32_t user : posts_.users())
+    if (posts_.bytes() > settings_.maxBytes || posts_.bytesOfUser(user) > settings_.maxBytesPerUser)
+      static_cast<void>(makeRoom(plan, user, 0));
+  commit(std::move(plan));
 }
 
 void Outbox::keepAll(std::vector<Incoming> posts) {
@@ -267,6 +278,8 @@ void Outbox::keepAll(std::vector<Incoming> posts) {
       commit(std::move(plan));  // what is new is displaced only when it is there
       plan = Plan();
       if (diskRests() || !makeRoom(plan, post.user, bytes)) {
+        for (const auto& [number, events] : plan.displaced) posts_.putBack(number);
+        plan.displaced.clear();
         refuse(incoming);
         continue;
       }
@@ -288,6 +301,8 @@ void Outbox::kept(Plan& plan) {
       ports_.counters.addAndMayLog(Reason::outboxDisplaced, ports_.clock.monotonic(), 0))
     ports_.log.error("Outbox(keep): It is full, %zu of the oldest posts are lost for newer ones",
                      plan.displaced.size());
+  size_.store(posts_.size(),
+              std::memory_order_relaxed);  // before anybody is told, so that nobody takes it for empty
   for (Incoming& incoming : plan.posts) {
     last_ = incoming.failed.post.number;
     const StoredPost& post = incoming.failed.post;
@@ -303,6 +318,7 @@ void Outbox::kept(Plan& plan) {
     if (incoming.failed.mayHaveLeft)
       tellOwner(post.url, post.events, post.body.view().size(), !incoming.failed.isUnanswered);
     ServerLine& line = *posts_.find(last_)->line;
+    line.isUnreachable = line.isUnreachable || incoming.failed.isUnanswered;
     line.lastStatus = incoming.failed.status;
     // What is being sent says by itself how the server is.
     if (line.posts == 1 && line.inFlight == 0) line.failures = 0;

@@ -197,6 +197,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void leave(KeptPosts::Entry& entry, Reason fate) REQUIRES(*queue_);
   [[nodiscard]] OutboxBooks::Events eventsOf(const KeptPosts::Entry& entry) REQUIRES(*queue_);
 
+  void keepBounds() REQUIRES(*queue_);
   void keepAll(std::vector<Incoming> posts) REQUIRES(*queue_);
   [[nodiscard]] bool makeRoom(Plan& plan, uint32_t user, uint64_t bytes) REQUIRES(*queue_);
   void commit(Plan plan) REQUIRES(*queue_);

@@ -54,6 +54,7 @@ void Outbox::load() {
                     static_cast<unsigned long long>(posts_.bytes()));
   // Devices that start at the same time do not all ask at the same time.
   for (auto& [server, line] : posts_.lines()) fail(line, std::nullopt, true);
+  keepBounds();
 }
 
 // Of these is not even known whose they were.

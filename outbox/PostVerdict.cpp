@@ -60,7 +60,10 @@ std::optional<Duration> retryAfter(const URLResponse* response, TimeValue now) {
   if (!text || text->empty()) return std::nullopt;
   int64_t seconds = 0;
   const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), seconds);
-  if (end != text->data() + text->size()) {
+  if (text->front() == '-') return std::nullopt;
+  const bool isNumber =
+      end == text->data() + text->size() || (end != text->data() && *end == ',');  // of each line the first
+  if (!isNumber) {
     const auto date = secondsOfDate(*text);
     if (!date) return std::nullopt;
     seconds = *date - now.seconds;

@@ -104,6 +104,8 @@ struct Limits {
   // Of the outbox, besides what is set: posts, since each takes 40 bytes of memory; bytes that wait for a slow disk;
   // bytes that are sent again at a time (one post to each server goes in any case).
   static constexpr size_t maxOutboxPosts = 131072;
+  static constexpr size_t maxOutboxPostsOfAUser =
+      maxOutboxPosts / 8 * 7;  // so that small ones displace no other user's
   static constexpr size_t maxBytesOnTheWayToTheOutbox = 8u << 20;
   static constexpr size_t maxBytesOfAUserOnTheWayToTheOutbox = 2u << 20;
   // A post that is not on its disk by then goes the usual way, so that no session waits longer for a disk that is stuck.

@@ -397,6 +397,78 @@ TEST_F(OutboxTest, DisplacesNothingForAPostThatTheDiskDoesNotTake) {
   EXPECT_EQ(openBodies().size(), 1U);
 }
 
+TEST_F(OutboxTest, LosesWhatItsBoundsAllowNoMoreAtTheStart) {
+  start();
+  for (uint32_t i = 0; i < 6; ++i) postAndKeep(std::string(900, 'x'), 1000 + i % 2);
+  stop();
+  settings_.maxBytes = 3000;
+  settings_.maxBytesPerUser = 1000;
+  start();
+  EXPECT_EQ(disk_->posts.size(), 2U);
+  EXPECT_TRUE(disk_->posts.contains(5) && disk_->posts.contains(6));
+  EXPECT_EQ(row(1000).droppedFor(Reason::outboxDisplaced), 4U);
+}
+
+TEST_F(OutboxTest, LosesNothingForAPostThatFindsNoRoomAfterAll) {
+  settings_.maxBytes = 3000;
+  settings_.maxBytesPerUser = 3000;
+  start();
+  postAndKeep(std::string(300, 'a'));
+  postAndKeep(std::string(2000, 'b'));
+  pass(seconds(6));
+  const size_t again = last();
+  EXPECT_EQ(body(again).front(), 'a') << "on its way, so it is not displaced";
+  answer(again, 200);
+  ASSERT_EQ(body(last()).front(), 'b');
+  postAndKeep(std::string(300, 'c'));
+  const auto outcome = post(std::string(2600, 'd'));
+  answer(last(), 503);
+  EXPECT_TRUE(outcome->response) << "it finds no room beside what is on its way";
+  EXPECT_EQ(disk_->posts.size(), 2U);
+  EXPECT_EQ(row().droppedFor(Reason::outboxDisplaced), 0U);
+}
+
+TEST_F(OutboxTest, IsNotEmptyOnceASessionIsToldThatAPostIsKept) {
+  start();
+  bool wasEmpty = true, isTold = false;
+  FailedPost failed;
+  failed.post.url = kServer;
+  outbox_->keep(std::move(failed), [&](bool) {
+    isTold = true;
+    wasEmpty = outbox_->isEmpty();
+  });
+  drain();
+  EXPECT_TRUE(isTold);
+  EXPECT_FALSE(wasEmpty);
+}
+
+TEST_F(OutboxTest, LetsNoUserFillItWithSmallPosts) {
+  start();
+  postAndKeep("another user's", 2000);
+  for (size_t i = 0; i < Limits::maxOutboxPostsOfAUser + 100; ++i) {
+    FailedPost failed;
+    failed.post.user = 1000;
+    failed.post.url = kServer;
+    outbox_->keep(std::move(failed), [](bool isKept) { EXPECT_TRUE(isKept); });
+    if (i % 64 == 0) drain();
+  }
+  drain();
+  EXPECT_EQ(disk_->posts.size(), Limits::maxOutboxPostsOfAUser + 1);
+  EXPECT_EQ(row(2000).outbox, 2U);
+}
+
+TEST_F(OutboxTest, DropsAlsoWhatItHadNotReadYet) {
+  start();
+  postAndKeep("kept");
+  stop();
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "not mounted"};
+  start();
+  disk_->problem.reset();
+  test_.clock.advance(Outbox::kDiskPause);
+  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_TRUE(disk_->posts.empty());
+}
+
 TEST_F(OutboxTest, KeepsNoPostLargerThanItsBounds) {
   settings_.maxBytesPerUser = 3000;
   start();

@@ -45,6 +45,7 @@ TEST(PostVerdict, GoesByTheStatusOfAReplyThatBrokeOff) {
 TEST(PostVerdict, ReadsRetryAfterAsSecondsOrDate) {
   EXPECT_EQ(pauseOf("120"), seconds(120));
   EXPECT_EQ(pauseOf("0"), seconds(0));
+  EXPECT_EQ(pauseOf("120, 240"), seconds(120)) << "of two lines the first";
   EXPECT_EQ(pauseOf("Sun, 06 Nov 1994 08:50:37 GMT"), seconds(60));
   EXPECT_EQ(pauseOf("Sun, 06 Nov 1994 08:00:00 GMT"), seconds(0));
 }
@@ -55,8 +56,8 @@ TEST(PostVerdict, WaitsForADayAtMost) {
 }
 
 TEST(PostVerdict, TakesNoNoticeOfANonsensicalRetryAfter) {
-  for (const char* text :
-       {"", "soon", "-5x", "12 s", "Sun, 99 Foo 1994 08:49:37 GMT", "Sun, 06 Nov 1994 08:49:37 CET"})
+  for (const char* text : {"", "soon", "-5x", "-5", "-99999999999999999999999", "12 s",
+                           "Sun, 99 Foo 1994 08:49:37 GMT", "Sun, 06 Nov 1994 08:49:37 CET"})
     EXPECT_EQ(pauseOf(text), std::nullopt) << text;
 }
 

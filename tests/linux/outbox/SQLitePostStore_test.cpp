@@ -448,6 +448,31 @@ TEST_F(SQLitePostStoreTest, GivesItsRoomBackWhenItIsEmpty) {
   EXPECT_EQ(numbersIn(store), std::vector<int64_t>({31}));
 }
 
+// Each change writes whole pages to the log, and those again to the file, however small the post is.
+TEST_F(SQLitePostStoreTest, WritesFewPagesForASmallPostThatIsKeptByItself) {
+  SQLitePostStore store(folder_.path());
+  constexpr int64_t kPosts = 200;
+  constexpr size_t kBody = 300, kMostOfEach = 8192;
+  uint64_t kept = 0;
+  ASSERT_FALSE(add(store, somePost(1, kBody)));
+  const uint64_t before = written();
+  for (int64_t number = 2; number <= kPosts; ++number) {
+    const StoredPost post = somePost(number, kBody);
+    kept += PostStore::bytesOf(post);
+    ASSERT_FALSE(add(store, post));
+  }
+  const uint64_t afterKeeping = written();
+  for (int64_t number = 1; number <= kPosts; ++number) ASSERT_FALSE(remove(store, {number}));
+  store.close();
+  const uint64_t all = written() - before;
+  std::printf(
+      "body of %zu bytes, alone: %.2f bytes written for each that is kept (%llu a post), %llu a post to keep it\n",
+      kBody, static_cast<double>(all) / static_cast<double>(kept),
+      static_cast<unsigned long long>(all / kPosts),
+      static_cast<unsigned long long>((afterKeeping - before) / kPosts));
+  EXPECT_LE(all / kPosts, kMostOfEach);
+}
+
 // All of a post's life: kept, sent, forgotten, in changes as the outbox makes them.
 TEST_F(SQLitePostStoreTest, WritesAtMostThreeBytesForEachThatItKeeps) {
   for (const size_t bodyBytes : {2100U, 20000U}) {
