@@ -10,6 +10,7 @@
 #include <variant>
 
 #include "platform/base/TextEscape.h"
+#include "tools/events/Document.h"
 #include "tools/events/EventsCheck.h"
 #include "tools/events/EventsFile.h"
 #include "tools/events/Generate.h"
@@ -47,6 +48,7 @@ void check(const EventsFile& file) {
   }
   for (const EventsLanguage language : {EventsLanguage::c, EventsLanguage::cxx, EventsLanguage::python})
     require(isValidUTF8(generateEvents(file, language)));
+  require(isValidUTF8(documentEvents(file)));
   for (const EventFinding& finding : checkEvents(file, bag()).findings) require(isPlainText(finding.text));
 }
 
