@@ -88,27 +88,27 @@ bool Outbox::hasRoomOnTheWay(uint32_t user, size_t bytes) {
 }
 
 void Outbox::keep(FailedPost post, Function<void(bool)> settled) {
+  if (takeIn(post, settled))
+    wake();
+  else
+    refuse(serverOfLine(post.post.url), std::move(settled));
+}
+
+bool Outbox::takeIn(FailedPost& post, Function<void(bool)>& settled) {
   const uint64_t bytes = PostStore::bytesOf(post.post);
   const uint32_t user = post.post.user;
   std::string server = serverOfLine(post.post.url);
-  {
-    MutexLock lock(mutex_);
-    const MonotonicTime now = ports_.clock.monotonic();
-    if (now >= diskRestsUntil_ && !isDiskSlow_ && hasRoomOnTheWay(user, bytes)) {
-      bytesOnTheWay_ += bytes;
-      bytesOfUsersOnTheWay_[user] += bytes;
-      inbox_.bytes += bytes;
-      inbox_.bytesOfUsers[user] += bytes;
-      inbox_.posts.push_back({std::move(post), ++lastTicket_});
-      waiting_[lastTicket_] = {std::move(settled), now, std::move(server)};
-      watchDeadline();
-      settled = nullptr;
-    }
-  }
-  if (settled)
-    refuse(server, std::move(settled));
-  else
-    wake();
+  MutexLock lock(mutex_);
+  const MonotonicTime now = ports_.clock.monotonic();
+  if (now < diskRestsUntil_ || isDiskSlow_ || !hasRoomOnTheWay(user, bytes)) return false;
+  bytesOnTheWay_ += bytes;
+  bytesOfUsersOnTheWay_[user] += bytes;
+  inbox_.bytes += bytes;
+  inbox_.bytesOfUsers[user] += bytes;
+  inbox_.posts.push_back({std::move(post), ++lastTicket_});
+  waiting_[lastTicket_] = {std::move(settled), now, std::move(server)};
+  watchDeadline();
+  return true;
 }
 
 void Outbox::watchDeadline() {

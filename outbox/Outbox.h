@@ -208,6 +208,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   // None: it was told already.
   [[nodiscard]] std::optional<Waiting> takeWaiting(uint64_t ticket) EXCLUDES(mutex_);
   [[nodiscard]] bool isWaiting(uint64_t ticket) const EXCLUDES(mutex_);
+  // Takes both, or neither.
+  [[nodiscard]] bool takeIn(FailedPost& post, Function<void(bool)>& settled) EXCLUDES(mutex_);
   [[nodiscard]] bool hasRoomOnTheWay(uint32_t user, size_t bytes) REQUIRES(mutex_);
   void watchDeadline() REQUIRES(mutex_);
   void tellWhoWaitedTooLong() EXCLUDES(mutex_);
