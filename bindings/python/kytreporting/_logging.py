@@ -13,9 +13,11 @@ class LoggingHandler(logging.Handler):
 
         logging.getLogger().addHandler(kyt.LoggingHandler(session, category=30, level=logging.WARNING))
 
-    The payload has logger, level, function, line and the unformatted text, which is the same for all its records. The
-    formatted message goes along only with formatted=True: it may hold what nobody meant to report. `payload` makes
-    another one of the record. Never raises and never blocks: what the queue has no room for is counted there.
+    The payload has logger, level, function and line, and of a record with arguments the unformatted text, which is the
+    same for all its records. A text without arguments may have been put together by the program (an f-string, an
+    exception) and hold what nobody meant to report: it goes along only with formatted=True, as the formatted message
+    does. `payload` makes another one of the record. Never raises and never blocks: what the queue has no room for is
+    counted there.
     """
 
     def __init__(
@@ -49,8 +51,9 @@ class LoggingHandler(logging.Handler):
             "level": record.levelname,
             "function": record.funcName,
             "line": record.lineno,
-            "text": str(record.msg),
         }
+        if record.args and isinstance(record.msg, str):
+            payload["text"] = record.msg
         if record.exc_info and record.exc_info[0] is not None:
             payload["exception"] = record.exc_info[0].__name__
         if self._formatted:

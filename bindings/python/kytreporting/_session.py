@@ -447,7 +447,7 @@ class Session:
 
         Gives up at once where no daemon ever took anything and none is there. False also when it has ended before.
         """
-        if self._pointer is None:  # nothing was sent in this forked child
+        if self._pointer is None and (self._ended or not self._has_sums()):  # nothing was sent in this forked child
             self._ended = True
             return True
         for counter in list(self._counters):
@@ -455,6 +455,9 @@ class Session:
                 counter.send()
         self._ended = True
         return bool(lib.kyt_session_finish(self._pointer, max(0, int(timeout * 1000))))
+
+    def _has_sums(self) -> bool:
+        return any(counter._has_sum() for counter in list(self._counters))
 
     async def afinish(self, timeout: float = 5.0) -> bool:
         """finish() for asyncio: a thread of the loop's executor waits."""
@@ -551,15 +554,17 @@ def send_single(
 def _at_exit() -> None:
     """What is queued is sent, then nothing of the library's calls into the interpreter any more."""
     end = time.monotonic() + _LAST_SECOND
-    for session in list(_sessions.values()):
-        if session._pointer is not None and not session._ended:
-            try:
-                session.finish(max(0.0, end - time.monotonic()))
-            except Error as error:  # of a counter's last message
-                print(f"kytreporting: {error}", file=sys.stderr)
-    with _program.opening:
-        _program.ended = True
-    lib.kyt_close_all()
+    try:
+        for session in list(_sessions.values()):
+            if not session._ended and (session._pointer is not None or session._has_sums()):
+                try:
+                    session.finish(max(0.0, end - time.monotonic()))
+                except Error as error:
+                    print(f"kytreporting: {error}", file=sys.stderr)
+    finally:  # whatever the program was told meanwhile, by Ctrl-C too
+        with _program.opening:
+            _program.ended = True
+        lib.kyt_close_all()
 
 
 def _after_fork_in_child() -> None:

@@ -7,7 +7,10 @@ import inspect
 import threading
 import time
 from types import TracebackType
-from typing import TYPE_CHECKING, Any, Callable, List, Optional, Type, TypeVar, cast
+from typing import TYPE_CHECKING, Any, Callable, Dict, List, Optional, Type, TypeVar, cast
+
+from ._errors import InvalidError
+from ._values import Dictionary
 
 if TYPE_CHECKING:
     from ._session import Session
@@ -15,7 +18,28 @@ if TYPE_CHECKING:
 F = TypeVar("F", bound=Callable[..., Any])
 
 
-class Timer:
+class _Measure:
+    """What a Timer and a Counter send. What cannot be meant is told when they are made; sending raises nothing, for no
+    program's own work is to fail for what is measured of it."""
+
+    def __init__(self, session: "Session", category: int, type: int, fields: Dict[str, Any]) -> None:
+        if not (0 <= category <= 0xFFFF and 0 <= type <= 0xFFFF):
+            raise InvalidError(f"category {category} and type {type}: both are 0 to 65535")
+        with Dictionary(fields):
+            self._session = session
+        self._category = category
+        self._type = type
+        self._fields = fields
+
+    def _send_with(self, **measured: Any) -> bool:
+        """Whether it was queued. What was not is in the session's statistics."""
+        try:
+            return self._session.send(self._category, self._type, dict(self._fields, **measured))
+        except Exception:  # pylint: disable=broad-except
+            return False
+
+
+class Timer(_Measure):
     """Sends how long something took: `duration` in seconds, and `error`, the exception's name, where one left it.
 
         with session.timed(20, 1, step="index"):
@@ -24,14 +48,12 @@ class Timer:
         @session.timed(20, 2)
         def search(words): ...      # also async functions
 
-    One Timer may be used again and from several threads. Sending never keeps the caller's exception back.
+    One Timer may be used again and from several threads. Sending raises nothing, and keeps the caller's exception and
+    result as they are: what the session does not take, ended or without a daemon, is in its statistics.
     """
 
     def __init__(self, session: "Session", category: int, type: int, /, **fields: Any) -> None:
-        self._session = session
-        self._category = category
-        self._type = type
-        self._fields = fields
+        super().__init__(session, category, type, fields)
         self._begun = threading.local()
 
     def __enter__(self) -> "Timer":
@@ -49,14 +71,10 @@ class Timer:
         self._send(time.perf_counter() - self._begun.times.pop(), kind)
 
     def _send(self, duration: float, error: Optional[Type[BaseException]]) -> None:
-        payload = dict(self._fields, duration=duration)
-        if error is not None:
-            payload["error"] = error.__name__
-        try:
-            self._session.send(self._category, self._type, payload)
-        except Exception:  # pylint: disable=broad-except  # the caller's own matters more
-            if error is None:
-                raise
+        if error is None:
+            self._send_with(duration=duration)
+        else:
+            self._send_with(duration=duration, error=error.__name__)
 
     def __call__(self, function: F) -> F:
         if inspect.iscoroutinefunction(function):
@@ -83,34 +101,32 @@ class Timer:
         return cast(F, timed)
 
 
-class Counter:
+class Counter(_Measure):
     """Sums up what happens too often for a message each.
 
         requests = session.counter(21, 1, interval=60, kind="request")
         requests.add()
 
     The sum leaves as one message, with `count` and `seconds` since the last, when add() finds that the interval is over,
-    and with flush() and finish(); a sum of nothing never leaves. Any thread.
+    and with flush() and finish(); a sum of nothing never leaves, and one that finds no room goes along with the next.
+    Raises nothing. Any thread.
     """
 
     def __init__(self, session: "Session", category: int, type: int, /, *, interval: float = 60.0, **fields: Any) -> None:
-        self._session = session
-        self._category = category
-        self._type = type
+        super().__init__(session, category, type, fields)
         self._interval = interval
-        self._fields = fields
         self._start_anew()
 
     def _start_anew(self) -> None:
         self._lock = threading.Lock()
         self._count = 0
-        self._begun = time.monotonic()
+        self._begun = self._tried = time.monotonic()
 
     def add(self, count: int = 1) -> None:
         """Adds to the sum."""
         with self._lock:
             self._count += count
-            over = time.monotonic() - self._begun >= self._interval
+            over = time.monotonic() - self._tried >= self._interval
         if over:
             self.send()
 
@@ -118,7 +134,12 @@ class Counter:
         """Sends the sum now, if there is one."""
         with self._lock:
             count, self._count = self._count, 0
-            now = time.monotonic()
-            seconds, self._begun = now - self._begun, now
-        if count:
-            self._session.send(self._category, self._type, dict(self._fields, count=count, seconds=seconds))
+            begun, self._begun = self._begun, time.monotonic()
+            self._tried = self._begun
+        if count and not self._send_with(count=count, seconds=self._tried - begun):
+            with self._lock:
+                self._count += count
+                self._begun = min(self._begun, begun)
+
+    def _has_sum(self) -> bool:
+        return self._count != 0

@@ -103,3 +103,27 @@ def test_nothing_is_opened_when_the_program_has_ended(kyt_listener, program):
         """
     )
     assert said == "the program ends\n"
+
+
+def test_a_program_that_is_interrupted_as_it_ends_hears_nothing_any_more(kyt_listener, program):
+    said = program(
+        """
+        import atexit
+        import kytreporting as kyt
+        from kytreporting import _session
+        session = kyt.Session(20)
+        def interrupted(*arguments):
+            raise KeyboardInterrupt
+        session.finish = interrupted
+        atexit.unregister(_session._at_exit)
+        try:
+            _session._at_exit()
+        except KeyboardInterrupt:
+            print("interrupted")
+        try:
+            kyt.send_single(1, 2, client_type=20)
+        except kyt.ClosedError as error:
+            print(error)
+        """
+    )
+    assert said == "interrupted\nthe program ends\n"

@@ -47,6 +47,23 @@ def test_a_child_that_does_not_report_opens_nothing(kyt_listener, program):
     assert len(kyt_listener.events("session")) == 1
 
 
+def test_a_sum_of_a_child_leaves_at_its_end(kyt_listener, program):
+    program(
+        """
+        import os, sys
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        counter = session.counter(21, 1, interval=3600)
+        child = os.fork()
+        if child == 0:
+            counter.add(5)
+            os._exit(0 if session.finish() else 1)
+        assert os.waitpid(child, 0)[1] == 0
+        """
+    )
+    assert kyt_listener.wait_for("message")[0]["payload"]["count"] == 5
+
+
 def test_forks_beside_busy_threads_harm_nobody(kyt_listener, program):
     said = program(
         """

@@ -31,6 +31,15 @@ def test_records_from_a_level_on_are_messages(kyt_listener):
     assert second["type"] == 40 and second["payload"]["exception"] == "OSError"
 
 
+def test_a_text_that_the_program_put_together_stays_where_it_is(kyt_listener):
+    with kyt.Session(20) as session:
+        logger = logger_of(kyt.LoggingHandler(session, 30))
+        logger.warning(f"login of {'anna@example.org'} failed")
+        logger.error(ValueError("for anna@example.org"))
+    for message in kyt_listener.wait_for("message", 2):
+        assert "text" not in message["payload"] and "anna" not in str(message["payload"])
+
+
 def test_what_was_formatted_goes_along_when_wanted(kyt_listener):
     with kyt.Session(20) as session:
         logger = logger_of(kyt.LoggingHandler(session, 30, logging.DEBUG, formatted=True))

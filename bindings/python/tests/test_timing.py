@@ -74,3 +74,47 @@ def test_a_sum_of_nothing_does_not_leave(kyt_listener):
     with kyt.Session(20) as session:
         session.counter(21, 1)
     assert session.statistics().accepted == 0
+
+
+def test_a_program_keeps_its_results_whatever_becomes_of_its_figures(kyt_listener, tmp_path):
+    ended = kyt.Session(20)
+    ended.close()
+    alone = kyt.Session(20, socket=str(tmp_path / "none"), wait_for_daemon=False)
+    for session in (ended, alone):
+        counter = session.counter(21, 1, interval=0)
+
+        @session.timed(20, 1)
+        def answer():
+            return 42
+
+        @session.timed(20, 1)
+        async def later():
+            return 43
+
+        assert answer() == 42 and asyncio.run(later()) == 43
+        counter.add()
+        with session.timed(20, 2):
+            pass
+    assert ended.statistics().dropped_closed == 4
+    alone.close()
+
+
+def test_what_cannot_be_meant_is_told_where_it_is_written(kyt_listener):
+    with kyt.Session(20) as session:
+        for make in (session.timed, session.counter):
+            with pytest.raises(kyt.InvalidError):
+                make(70000, 1)
+            with pytest.raises(kyt.InvalidError):
+                make(20, 1, field=object())
+
+
+def test_a_sum_that_finds_no_room_goes_along_with_the_next(kyt_listener, monkeypatch):
+    with kyt.Session(20) as session:
+        counter = session.counter(21, 1, interval=0)
+        monkeypatch.setattr(session, "send", lambda *arguments, **named: False)
+        counter.add(3)
+        counter.add(4)
+        monkeypatch.undo()
+        counter.add(5)
+    (message,) = kyt_listener.wait_for("message")
+    assert message["payload"]["count"] == 12 and message["payload"]["seconds"] > 0
