@@ -49,7 +49,8 @@ bool HttpConnection::send(std::string_view bytes) const {
 
 bool HttpConnection::fill(steady_clock::time_point deadline) {
   if (!socket_) return false;
-  const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
+  // Rounded up: whoever waited to the end must find the deadline passed.
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - steady_clock::now());
   pollfd waiting{socket_.get(), POLLIN, 0};
   if (::poll(&waiting, 1, static_cast<int>(std::max<long>(left.count(), 0))) <= 0) return false;
   char block[65536];
