@@ -166,6 +166,7 @@ const kyt_last_word* lastWord = nullptr;
 TEST_F(Habits, ALastWordOfACrashingProgramArrives) {
   kyt_dictionary* info = kyt_dictionary_new();
   kyt_dictionary_set_int(info, "ClientType", 20);
+  kyt_dictionary_set_uint(info, "SessionID", 7);
   kyt_dictionary* payload = kyt_dictionary_new();
   kyt_dictionary_set_string(payload, "version", "1.2");
   kyt_options options{};

@@ -270,14 +270,16 @@ KYT_API void kyt_send_single_message(const kyt_options* options, uint32_t catego
 
 /* A program's last word: one event, encoded when the program is well, and sent by a handler of SIGSEGV, SIGABRT and the
  * like. Of the options the socket, session information and user information count. Null for missing options, wrong session
- * information, numbers out of range, a socket's path that is too long, and more than a megabyte. Made once, it can be sent
- * any number of times, by one thread at a time. */
+ * information, numbers out of range, a socket's path that is too long, and more than a megabyte. The session information must
+ * have a client type and a session ID, else the daemon takes nothing. Made once, it can be sent any number of times, by one
+ * thread at a time, and as the user that made it: who gives up privileges makes it afterwards. */
 typedef struct kyt_last_word kyt_last_word;
 KYT_API kyt_last_word* kyt_last_word_new(const kyt_options* options, uint32_t category, uint32_t type,
                                          const kyt_dictionary* payload);
 KYT_API void kyt_last_word_free(kyt_last_word* word);
 /* Async-signal-safe: on a connection of its own, with no memory taken, no lock and no part of the library but this. Whether
- * the daemon answered that it has taken the event, within so many milliseconds. Leaves errno as it was. */
+ * the daemon answered that it has taken the event, within so many milliseconds: not where the client type has no storebag,
+ * or the session information lacks what a session needs. Leaves errno as it was. */
 KYT_API int kyt_last_word_send(const kyt_last_word* word, unsigned timeout_milliseconds);
 
 #ifdef __cplusplus

@@ -15,6 +15,19 @@ namespace {
 
 constexpr int kMillisecondsBetweenAttempts = 5;  // while too many connections wait
 constexpr char kMethodReturn = 2;                // the second byte of such a message
+// What the daemon returns where it has taken a single message, as the body ends; any other text says why it has not.
+constexpr char kTaken[] = "finished";
+
+constexpr size_t kMostOfAnswer = 512;  // one that has taken the event is shorter
+constexpr size_t kFixedHeaderBytes = 16;
+
+// Of a message whose fixed header this is, written by a program of this machine: in its byte order.
+uint64_t messageSize(const char* header) noexcept {
+  uint32_t body = 0, fields = 0;
+  std::memcpy(&body, header + 4, sizeof body);
+  std::memcpy(&fields, header + 12, sizeof fields);
+  return ((kFixedHeaderBytes + uint64_t{fields} + 7) & ~uint64_t{7}) + body;
+}
 
 int64_t nowMilliseconds() noexcept {
   timespec now{};
@@ -47,10 +60,10 @@ bool LastSocket::send(unsigned timeoutMilliseconds) const noexcept {
   const int before = errno;
   const int64_t deadline = nowMilliseconds() + timeoutMilliseconds;
   const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  const bool answered = fd >= 0 && exchange(fd, deadline);
+  const bool isTaken = fd >= 0 && exchange(fd, deadline);
   if (fd >= 0) close(fd);
   errno = before;
-  return answered;
+  return isTaken;
 }
 
 bool LastSocket::exchange(int fd, int64_t deadline) const noexcept {
@@ -59,7 +72,7 @@ bool LastSocket::exchange(int fd, int64_t deadline) const noexcept {
     if (nowMilliseconds() >= deadline) return false;
     if (errno == EAGAIN) poll(nullptr, 0, kMillisecondsBetweenAttempts);
   }
-  return write(fd, deadline) && isAnswered(fd, deadline);
+  return write(fd, deadline) && isTaken(fd, deadline);
 }
 
 bool LastSocket::write(int fd, int64_t deadline) const noexcept {
@@ -72,9 +85,10 @@ bool LastSocket::write(int fd, int64_t deadline) const noexcept {
   return true;
 }
 
-bool LastSocket::isAnswered(int fd, int64_t deadline) noexcept {
-  int lines = 0;       // of the handshake
-  size_t message = 0;  // bytes of what follows it
+bool LastSocket::isTaken(int fd, int64_t deadline) noexcept {
+  int lines = 0;  // of the handshake
+  char message[kMostOfAnswer];
+  size_t size = 0;
   while (waitFor(fd, POLLIN, deadline)) {
     char bytes[256];
     const ssize_t got = recv(fd, bytes, sizeof bytes, 0);
@@ -82,10 +96,16 @@ bool LastSocket::isAnswered(int fd, int64_t deadline) noexcept {
     for (ssize_t i = 0; i < got; ++i) {
       if (lines < 2) {
         if (bytes[i] == '\n') ++lines;
-      } else if (message++ == 1) {
-        return bytes[i] == kMethodReturn;
+      } else if (size < sizeof message) {
+        message[size++] = bytes[i];
       }
     }
+    if (size < kFixedHeaderBytes) continue;
+    const uint64_t whole = messageSize(message);
+    if (message[1] != kMethodReturn || whole > sizeof message) return false;
+    if (size >= whole)
+      return whole >= sizeof kTaken &&
+             std::memcmp(message + whole - sizeof kTaken, kTaken, sizeof kTaken) == 0;
   }
   return false;
 }
