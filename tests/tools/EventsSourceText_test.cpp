@@ -68,6 +68,7 @@ TEST(EventsSourceText, DoesNotEndALiteral) {
   EXPECT_EQ(literal("é1?\?/"), R"("\303\2511\?\?/")");
   EXPECT_EQ(pythonLiteral("a\"b\\cé"), R"("a\"b\\cé")");
   EXPECT_EQ(docString("say \"\"\"", "  "), "  \"\"\"say \\\"\\\"\\\"\"\"\"\n");
+  EXPECT_EQ(docString("say \"hi\" \n", ""), "\"\"\"say \"hi\\\"\"\"\"\n");
   EXPECT_EQ(docString("C:\\N{x} \"a\" b", ""), "\"\"\"C:\\\\N{x} \"a\" b\"\"\"\n");
   EXPECT_EQ(docString("one\n\ntwo\\", "  "), "  \"\"\"one\n\n  two\\\\\n  \"\"\"\n");
 }

@@ -81,6 +81,8 @@ std::string lineComment(std::string_view text, const std::string& indent) {
 }
 
 std::string docString(std::string_view text, const std::string& indent) {
+  // A quote is the last one also where only what is left out stands behind it.
+  text = text.substr(0, text.find_last_not_of(" \t\r\n") + 1);
   std::string escaped;
   for (size_t at = 0; at < text.size(); ++at) {
     const bool isLast = at + 1 == text.size();
