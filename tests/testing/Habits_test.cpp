@@ -128,6 +128,47 @@ TEST_F(Habits, ATimerSendsSecondsUnlessItIsCancelled) {
   EXPECT_EQ(daemon_.events(Kind::message).size(), 1U);
 }
 
+TEST_F(Habits, SumsThatFindNoRoomGoAlongWithTheNext) {
+  daemon_.stop();
+  KYTReporting::Options options = optionsFor(daemon_.socketPath());
+  options.maxQueuedMessages = 64;
+  const auto session = KYTReporting::open(std::move(options), {});
+  Counter counter(*session, 21, 1, std::chrono::milliseconds(0));
+  for (int i = 0; i < 70; ++i) counter.add(5);
+  EXPECT_EQ(session->statistics().queued, 64U);
+  EXPECT_FALSE(daemon_.start());
+  EXPECT_TRUE(eventually([&] { return session->statistics().queued == 0; }));
+  counter.add(1);
+  EXPECT_TRUE(session->finish(std::chrono::seconds(30)));
+  const std::vector<Event> sent = daemon_.events(Kind::message);
+  ASSERT_EQ(sent.size(), 65U);
+  EXPECT_EQ(sent[63].payload.integer("count"), 5);
+  EXPECT_EQ(sent[64].payload.integer("count"), 31);
+}
+
+TEST_F(Habits, SumsOfManyThreadsAreWholeWhoeverSendsThem) {
+  const auto session = open();
+  const auto begun = std::chrono::steady_clock::now();
+  {
+    Counter counter(*session, 21, 1, std::chrono::milliseconds(1));
+    std::vector<std::jthread> threads;
+    for (int i = 0; i < 4; ++i)
+      threads.emplace_back([&counter] {
+        for (int n = 0; n < 100000; ++n) counter.add();
+      });
+  }
+  const double passed = std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count();
+  EXPECT_TRUE(session->finish(std::chrono::seconds(30)));
+  int64_t count = 0;
+  double seconds = 0;
+  for (const Event& event : daemon_.events(Kind::message)) {
+    count += event.payload.integer("count");
+    seconds += event.payload.find("seconds")->doubleValue();
+  }
+  EXPECT_EQ(count, 400000);
+  EXPECT_LE(seconds, passed);
+}
+
 TEST_F(Habits, ACounterSendsSumsOfItsInterval) {
   const auto session = open();
   {

@@ -58,8 +58,9 @@ class Timer {
 };
 
 // Sums up what happens too often for a message each. The sum leaves as one message with "count", and "seconds" since the
-// last, when add() finds that the interval is over, and when the counter is destroyed; a sum of nothing never leaves.
-// add() and send() may be called from any thread, and take no lock.
+// last, when add() finds that the interval is over, and when the counter is destroyed; a sum of nothing never leaves. What
+// the session's queue has no room for goes along with the next sum.
+// add() and send() may be called from any thread, and take no lock; while one thread sends, others go on.
 class Counter {
  public:
   Counter(KYTReporting& session, uint32_t category, uint32_t type,
@@ -75,27 +76,36 @@ class Counter {
 
   void add(uint64_t count = 1) {
     count_.fetch_add(count, std::memory_order_relaxed);
-    if (Clock::now().time_since_epoch() - begun_.load(std::memory_order_relaxed) >= interval_) send();
+    if (Clock::now().time_since_epoch() - tried_.load(std::memory_order_relaxed) >= interval_) send();
   }
   void send() {
+    if (sending_.exchange(true, std::memory_order_acquire)) return;
     const Clock::duration now = Clock::now().time_since_epoch();
-    const Clock::duration begun = begun_.exchange(now, std::memory_order_relaxed);
+    tried_.store(now, std::memory_order_relaxed);
     const uint64_t count = count_.exchange(0, std::memory_order_relaxed);
-    if (count == 0) return;
-    Dictionary payload = payload_;
-    payload.set("count", count);
-    payload.set("seconds", asValue(now - begun));
-    session_.sendMessage(category_, type_, std::move(payload));
+    if (count == 0 || sends(count, now - begun_))
+      begun_ = now;
+    else
+      count_.fetch_add(count, std::memory_order_relaxed);
+    sending_.store(false, std::memory_order_release);
   }
 
  private:
   using Clock = std::chrono::steady_clock;
+  bool sends(uint64_t count, Clock::duration seconds) {
+    Dictionary payload = payload_;
+    payload.set("count", count);
+    payload.set("seconds", asValue(seconds));
+    return session_.sendMessage(category_, type_, std::move(payload));
+  }
   KYTReporting& session_;
   const uint32_t category_, type_;
   const std::chrono::milliseconds interval_;
   const Dictionary payload_;
   std::atomic<uint64_t> count_{0};
-  std::atomic<Clock::duration> begun_{Clock::now().time_since_epoch()};
+  std::atomic<bool> sending_{false};
+  Clock::duration begun_ = Clock::now().time_since_epoch();  // of the sum; whoever sends
+  std::atomic<Clock::duration> tried_{begun_};
 };
 
 }  // namespace kyt
