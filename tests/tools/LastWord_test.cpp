@@ -1,8 +1,7 @@
 // What a program's last word says of itself, against the daemon: that it is taken only where it is.
-#include <kytreporting/kytreporting.h>
-
 #include <memory>
 
+#include "kytreporting/kytreporting.h"
 #include "tests/integration/StageFixture.h"
 
 namespace kyt {
