@@ -66,7 +66,7 @@ class Bystander {
 class HostilePeers : public CurlURLSessionFixture {
  protected:
   HostilePeers() { options_.certificateFile = authority_.file(); }
-  void SetUp() override { options_.noProgressTimeout = std::chrono::seconds(kSanitized ? 8 : 3); }
+  void SetUp() override { options_.noProgressTimeout = std::chrono::seconds(kSanitized ? 5 : 3); }
 
   // What befell a session's posts, all of which have other texts.
   struct Visit {
