@@ -32,6 +32,14 @@ bool mayBeShown(std::string_view sequence) {
   return true;
 }
 
+// Of a valid sequence of three bytes at most.
+uint16_t codeUnit(std::string_view sequence) {
+  const auto bits = [&](size_t index) { return byteAt(sequence, index) & 0x3FU; };
+  if (sequence.size() == 1) return byteAt(sequence, 0);
+  if (sequence.size() == 2) return static_cast<uint16_t>((byteAt(sequence, 0) & 0x1FU) << 6 | bits(1));
+  return static_cast<uint16_t>((byteAt(sequence, 0) & 0x0FU) << 12 | bits(1) << 6 | bits(2));
+}
+
 void appendEscapedByte(std::string& out, uint8_t byte) {
   switch (byte) {
     case '\t':
@@ -100,6 +108,25 @@ std::string escapedText(std::string_view text) {
   std::string out;
   out.reserve(text.size() + 16);
   appendEscaped(out, text);
+  return out;
+}
+
+std::string escapedJSON(std::string_view json) {
+  std::string out;
+  out.reserve(json.size() + 16);
+  while (!json.empty()) {
+    const size_t length = utf8SequenceLength(json);
+    const std::string_view sequence = json.substr(0, std::max<size_t>(length, 1));
+    if (length != 0 && mayBeShown(sequence)) {
+      out.append(sequence);
+    } else {
+      const uint16_t unit = length != 0 ? codeUnit(sequence) : 0xFFFD;
+      out += "\\u";
+      appendHexByte(static_cast<uint8_t>(unit >> 8), out);
+      appendHexByte(static_cast<uint8_t>(unit & 0xFF), out);
+    }
+    json.remove_prefix(sequence.size());
+  }
   return out;
 }
 

@@ -17,6 +17,8 @@ void appendEscaped(std::string& out, std::string_view text);
 [[nodiscard]] std::string escapedText(std::string_view text);
 // The same for names that are told from each other: a backslash of their own becomes \x5c, so that no two are written alike.
 [[nodiscard]] std::string escapedName(std::string_view name);
+// The same for a text that is JSON, and stays it: such characters become \uHHHH, what is no valid UTF-8 \ufffd.
+[[nodiscard]] std::string escapedJSON(std::string_view json);
 // The same with the line breaks of the text left as they are.
 void appendEscapedLines(std::string& out, std::string_view text);
 // How much of the text, whole characters, becomes at most so many bytes when it is escaped.

@@ -40,7 +40,7 @@ Value inJSON(const Value& value) {
 }
 
 void print(const Dictionary& line) {
-  std::printf("%s\n", escapedText(description(inJSON(line))).c_str());
+  std::printf("%s\n", escapedJSON(description(inJSON(line))).c_str());
   std::fflush(stdout);
 }
 

@@ -51,7 +51,7 @@ class SessionScript::Aggregated {
                     {"type", static_cast<unsigned>(message.type)}};
     if (message.sessionInfo) line.set("sessionInfo", *message.sessionInfo);
     if (message.payload) line.set("payload", *message.payload);
-    const std::string text = escapedText(description(Dictionary{{"aggregated", std::move(line)}}));
+    const std::string text = escapedJSON(description(Dictionary{{"aggregated", std::move(line)}}));
     std::printf("%s\n", text.c_str());
     std::fflush(stdout);
     const std::lock_guard lock(mutex_);

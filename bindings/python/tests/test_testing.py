@@ -25,3 +25,11 @@ def test_a_listener_says_that_it_cannot_listen(tmp_path, capfd):
     with pytest.raises(RuntimeError, match="status 1"):
         Listener(str(tmp_path / "missing" / "socket")).start()
     assert "kytctl: " in capfd.readouterr().err
+
+
+def test_every_text_comes_back_as_it_was(kyt_listener):
+    texts = ["a\u2028b", "\x7f", "\x85", "\u202e", "\u2066", "tab\tline\n", 'quote " and \\', "\U0001f600", "\x01"]
+    with kyt.Session(20) as session:
+        for text in texts:
+            session.send(1, 1, text=text)
+    assert [message["payload"]["text"] for message in kyt_listener.wait_for("message", len(texts))] == texts

@@ -24,6 +24,13 @@ TEST(TextEscape, WritesControlCharactersAsTheirBytes) {
   EXPECT_FALSE(isPlainText("\x1b"));
 }
 
+TEST(TextEscape, LeavesJSONWhatItIs) {
+  EXPECT_EQ(escapedJSON("{\"a\":\"ä\\n€\"}"), "{\"a\":\"ä\\n€\"}");
+  EXPECT_EQ(escapedJSON("\x7f\xC2\x85\xE2\x80\xA8\xE2\x80\xAE\xE2\x81\xA6\x01"),
+            "\\u007f\\u0085\\u2028\\u202e\\u2066\\u0001");
+  EXPECT_EQ(escapedJSON("\xFFz\xE2\x80"), "\\ufffdz\\ufffd\\ufffd");
+}
+
 TEST(TextEscape, NamesTabsAndLineBreaks) {
   EXPECT_EQ(escapedText("a\tb\nc\rd"), "a\\tb\\nc\\rd");
 }
