@@ -4,8 +4,11 @@
 
 #include <array>
 #include <cstring>
+#include <string_view>
 #include <utility>
 #include <variant>
+
+#include "platform/base/TextEscape.h"
 
 namespace kyt::reader {
 
@@ -66,10 +69,12 @@ bool isGood(const Result& result) {
   return status == PGRES_COMMAND_OK || status == PGRES_TUPLES_OK;
 }
 
-// What is wrong with the values: class 22 of the standard's codes.
-bool isAboutData(const Result& result) {
-  const char* state = PQresultErrorField(result.get(), PG_DIAG_SQLSTATE);
-  return state != nullptr && std::strncmp(state, "22", 2) == 0;
+// Whether another post may do better. 22: its values are wrong. 54: it is too deep, too long. 53200 and XX000: what it makes
+// of them takes more memory than there is, or than PostgreSQL asks for at a time. All else is of the database.
+bool isAboutThePost(const Result& result) {
+  const char* field = PQresultErrorField(result.get(), PG_DIAG_SQLSTATE);
+  const std::string_view state = field != nullptr ? field : "";
+  return state.substr(0, 2) == "22" || state.substr(0, 2) == "54" || state == "53200" || state == "XX000";
 }
 
 std::string messageOf(const Result& result) {
@@ -134,7 +139,7 @@ std::optional<bool> Table::storeOne(const Post& post, Stored& stored, std::strin
       PQexecPrepared(connection_->handle, "post", values.size(), values.data(), nullptr, nullptr, 0));
   if (!isGood(result)) {
     problem = messageOf(result);
-    return isAboutData(result) ? std::optional(false) : std::nullopt;
+    return isAboutThePost(result) ? std::optional(false) : std::nullopt;
   }
   if (std::strcmp(PQgetvalue(result.get(), 0, 0), "0") == 0)
     ++stored.repeats;
@@ -144,17 +149,16 @@ std::optional<bool> Table::storeOne(const Post& post, Stored& stored, std::strin
 }
 
 bool Table::setAside(const Post& post, const std::string& reason, Stored& stored, std::string& problem) {
-  const std::array<const char*, 11> values = {post.id.c_str(),
-                                              post.received.c_str(),
-                                              post.path.c_str(),
-                                              post.sender.c_str(),
-                                              post.client.c_str(),
-                                              post.service.c_str(),
-                                              post.clientVersion.c_str(),
-                                              post.digest.c_str(),
-                                              post.encoding.c_str(),
-                                              reason.c_str(),
-                                              post.body.data()};
+  // Facts that are no text would not go aside either.
+  std::array<std::string, 10> facts = {post.id,       post.received, post.path,          post.sender,
+                                       post.client,   post.service,  post.clientVersion, post.digest,
+                                       post.encoding, reason};
+  std::array<const char*, 11> values{};
+  for (size_t i = 0; i < facts.size(); ++i) {
+    facts[i] = escapedText(facts[i]);
+    values[i] = facts[i].c_str();
+  }
+  values[10] = post.body.data();
   std::array<int, 11> lengths{}, formats{};
   lengths[10] = static_cast<int>(post.body.size());
   formats[10] = 1;  // as bytes

@@ -1,5 +1,6 @@
 // The database that posts go into: PostgreSQL. Each post is stored once, whatever its number of repeats, with its events as
-// rows that people query; what cannot be read stands aside with its reason and its body. One thread.
+// rows that people query; what cannot be read, or is too much for the database, stands aside with its reason and its body, its
+// facts escaped. One thread.
 #pragma once
 
 #include <cstdint>
@@ -27,7 +28,7 @@ class Table {
   // Connects, and makes the tables where there are none.
   [[nodiscard]] std::optional<std::string> open();
   // All of them in one transaction, committed when this returns without an error. After one none of them is stored, and
-  // open() is due.
+  // open() is due: the connection or the database failed, not a post.
   [[nodiscard]] std::optional<std::string> store(const std::vector<Post>& posts, Stored& stored);
 
  private:

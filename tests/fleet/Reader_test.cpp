@@ -112,7 +112,8 @@ class Reader : public ::testing::Test {
   [[nodiscard]] std::string said() const { return folder_.read("reader.log"); }
 
   // As the receiver publishes it.
-  void put(const std::string& name, const std::string& body, const std::string& encoding = "gzip") {
+  void put(const std::string& name, const std::string& body, const std::string& encoding = "gzip",
+           const std::string& sender = "QPW") {
     natsMsg* message = nullptr;
     ASSERT_EQ(natsMsg_Create(&message, "kyt.events.0", nullptr, body.data(), static_cast<int>(body.size())),
               NATS_OK);
@@ -120,7 +121,7 @@ class Reader : public ::testing::Test {
          std::vector<std::pair<const char*, std::string>>{{"Kyt-Id", name.empty() ? "" : idOf(name)},
                                                           {"Kyt-Received", "1769860800123"},
                                                           {"Kyt-Path", "/v1/events"},
-                                                          {"Kyt-Sender", "QPW"},
+                                                          {"Kyt-Sender", sender},
                                                           {"Kyt-Client", "person"},
                                                           {"Kyt-Encoding", encoding},
                                                           {"Kyt-Digest", "valid"}})
@@ -133,6 +134,18 @@ class Reader : public ::testing::Test {
     const bool isSo = eventually([&] { return (last = postgres_->query(sql)) == answer + "\n"; });
     EXPECT_TRUE(isSo) << sql << ": " << last << said();
     return isSo;
+  }
+  // The database refuses what it is to store: posts of that device, or all where there is none.
+  void refuse(const std::string& code, const std::string& device = "") {
+    ASSERT_TRUE(holds("SELECT count(*) FROM kyt_posts", "0"));
+    const std::string body = "BEGIN RAISE EXCEPTION USING ERRCODE = '" + code + "'; END";
+    const std::string when = device.empty() ? "" : "WHEN (NEW.client_id = '" + device + "') ";
+    const std::string name = "refuse_" + code;
+    const std::string said = postgres_->query("CREATE FUNCTION " + name + "() RETURNS trigger AS $$ " + body +
+                                              " $$ LANGUAGE plpgsql; CREATE TRIGGER " + name +
+                                              " BEFORE INSERT ON kyt_posts FOR EACH ROW " + when +
+                                              "EXECUTE FUNCTION " + name + "()");
+    ASSERT_EQ(said.find("ERROR"), std::string::npos) << said;
   }
   // What the consumer has not acknowledged, or not been given.
   [[nodiscard]] uint64_t unread() const {
@@ -198,6 +211,51 @@ TEST_F(Reader, SetsAsideWhatCannotBeReadAndGoesOn) {
       postgres_->query("SELECT reason, body FROM kyt_unreadable WHERE id LIKE 'message % of kyt-events'"),
       "no Kyt-Id, or headers that cannot be read|\\x77686f2077726f746520746869733f\n");
   EXPECT_TRUE(eventually([this] { return unread() == 0; })) << "nothing comes again for ever";
+}
+
+TEST_F(Reader, SetsAsideWhatIsTooMuchForTheDatabaseAndGoesOn) {
+  startReader();
+  refuse("53200", "device-1");
+  put("deep", gzipped("{\"events\":" + std::string(200'000, '[') + std::string(200'000, ']') + "}"));
+  std::string many = "{\"events\":[0";
+  for (int i = 0; i < 17'000'000; ++i) many += ",0";
+  put("many", gzipped(many + "]}"));  // what it makes of them is more than PostgreSQL takes of its memory
+  put("memory", gzipped(message(1)));
+  put("good", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_posts", idOf("good")));
+  EXPECT_TRUE(holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_unreadable",
+                    idOf("deep") + " " + idOf("many") + " " + idOf("memory")));
+  EXPECT_EQ(postgres_->query("SELECT reason FROM kyt_unreadable WHERE id = '" + idOf("deep") + "'"),
+            "stack depth limit exceeded\n");
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+  EXPECT_EQ(end(), 0);
+  EXPECT_NE(said().find("1 posts stored, 0 repeats left out, 3 that"), std::string::npos) << said();
+}
+
+TEST_F(Reader, SetsAsideAPostWhoseFactsAreNoUTF8) {
+  startReader();
+  put("facts", gzipped(message(1)), "gzip", "Q\xffW");
+  put("all", "text", "\xfe", "Q\xffW");
+  put("good", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_posts", idOf("good")));
+  EXPECT_TRUE(holds("SELECT string_agg(id || ' ' || sender, ' ' ORDER BY id) FROM kyt_unreadable",
+                    idOf("all") + " Q\\xffW " + idOf("facts") + " Q\\xffW"));
+  EXPECT_EQ(postgres_->query("SELECT encoding, reason FROM kyt_unreadable WHERE id = '" + idOf("all") + "'"),
+            "\\xfe|unknown encoding \"\\xfe\"\n");
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+}
+
+TEST_F(Reader, WaitsForADatabaseThatCannotStoreAndSetsNothingAside) {
+  startReader();
+  refuse("53100");  // its disk is full
+  put("good", gzipped(message(1)));
+  put("no-gzip", "no gzip");
+  EXPECT_TRUE(eventually([this] { return said().find("53100") != std::string::npos; })) << said();
+  EXPECT_EQ(postgres_->query("SELECT count(*) FROM kyt_unreadable"), "0\n");
+  EXPECT_EQ(unread(), 2U);
+  static_cast<void>(postgres_->query("DROP TRIGGER refuse_53100 ON kyt_posts"));
+  EXPECT_TRUE(holds("SELECT string_agg(id, ' ') FROM kyt_posts", idOf("good")));
+  EXPECT_TRUE(holds("SELECT string_agg(id, ' ') FROM kyt_unreadable", idOf("no-gzip")));
 }
 
 TEST_F(Reader, LosesAndDoublesNothingWhereItDiesOrTheDatabaseDoes) {
