@@ -165,7 +165,8 @@ bool Table::setAside(const Post& post, const std::string& reason, Stored& stored
   const Result result(PQexecPrepared(connection_->handle, "unreadable", values.size(), values.data(),
                                      lengths.data(), formats.data(), 0));
   if (!isGood(result)) problem = messageOf(result);
-  if (isGood(result)) ++stored.unreadable;
+  if (isGood(result))
+    ++(std::strcmp(PQcmdTuples(result.get()), "0") == 0 ? stored.repeats : stored.unreadable);
   return isGood(result);
 }
 

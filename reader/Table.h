@@ -13,6 +13,7 @@
 
 namespace kyt::reader {
 
+// How many were new, came again (also those that stand aside), or were set aside.
 struct Stored {
   uint64_t posts = 0, repeats = 0, unreadable = 0;
 };

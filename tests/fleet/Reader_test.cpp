@@ -213,6 +213,17 @@ TEST_F(Reader, SetsAsideWhatCannotBeReadAndGoesOn) {
   EXPECT_TRUE(eventually([this] { return unread() == 0; })) << "nothing comes again for ever";
 }
 
+TEST_F(Reader, CountsWhatItSetAsideOnce) {
+  startReader();
+  for (int i = 0; i < 3; ++i) put("no-gzip", "no gzip");
+  put("good", gzipped(message(1)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "1"));
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+  EXPECT_EQ(postgres_->query("SELECT count(*) FROM kyt_unreadable"), "1\n");
+  EXPECT_EQ(end(), 0);
+  EXPECT_NE(said().find("1 posts stored, 2 repeats left out, 1 that"), std::string::npos) << said();
+}
+
 TEST_F(Reader, SetsAsideWhatIsTooMuchForTheDatabaseAndGoesOn) {
   startReader();
   refuse("53200", "device-1");
