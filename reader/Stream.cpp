@@ -9,6 +9,7 @@ namespace kyt::reader {
 namespace {
 
 constexpr int64_t kMostBytes = 64 << 20;  // of one batch
+constexpr int kQuietCalls = 4;            // of next(), after which the consumer is asked for
 
 struct Freer {
   void operator()(natsOptions* options) const { natsOptions_Destroy(options); }
@@ -82,6 +83,7 @@ Stream::~Stream() = default;
 
 std::optional<std::string> Stream::open() {
   *handles_ = Handles();
+  quietCalls_ = 0;
   natsOptions* made = nullptr;
   natsStatus status = natsOptions_Create(&made);
   const Handle<natsOptions> options(made);
@@ -135,7 +137,18 @@ std::vector<Post> Stream::next(std::chrono::milliseconds time, std::optional<std
   natsMsgList_Destroy(&list);
   if (posts.empty() && status != NATS_OK && status != NATS_TIMEOUT)
     problem = failure("nothing can be read", status);
+  quietCalls_ = posts.empty() && !problem ? quietCalls_ + 1 : 0;
+  if (quietCalls_ >= kQuietCalls) problem = askForConsumer();
   return posts;
+}
+
+std::optional<std::string> Stream::askForConsumer() {
+  quietCalls_ = 0;
+  jsConsumerInfo* info = nullptr;
+  const natsStatus status = js_GetConsumerInfo(&info, handles_->context.get(), options_.stream.c_str(),
+                                               options_.durable.c_str(), nullptr, nullptr);
+  jsConsumerInfo_Destroy(info);
+  return status == NATS_OK ? std::nullopt : std::optional(failure("no consumer", status));
 }
 
 std::optional<std::string> Stream::acknowledge() {

@@ -28,6 +28,11 @@ void say(const std::string& text) {
   std::fprintf(stderr, "kytreader: %s\n", escapedText(text).c_str());
 }
 
+// Between attempts: half a second, or less where this program is to end.
+void rest() {
+  for (int i = 0; i < 10 && !isStopping; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+}
+
 // Until it works or this program is to end; says what is wrong once for each reason.
 template <typename Work>
 bool untilDone(Work work) {
@@ -37,7 +42,7 @@ bool untilDone(Work work) {
     if (!problem) return true;
     if (*problem != said) say(*problem);
     said = *problem;
-    for (int i = 0; i < 10 && !isStopping; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    rest();
   }
   return false;
 }
@@ -52,6 +57,10 @@ void run(Stream& stream, Table& table) {
     const std::vector<Post> posts = stream.next(std::chrono::milliseconds(500), problem);
     if (problem && *problem != said) say(*problem);
     said = problem.value_or("");
+    if (problem) {
+      rest();
+      if (!untilDone([&] { return stream.open(); })) break;
+    }
     if (posts.empty()) continue;
     const bool isStored = untilDone([&] {
       auto failed = table.store(posts, stored);

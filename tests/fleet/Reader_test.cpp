@@ -2,9 +2,12 @@
 // read.
 #include <gtest/gtest.h>
 #include <nats/nats.h>
+#include <unistd.h>
 #include <zlib.h>
 
+#include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <memory>
 #include <optional>
 #include <string>
@@ -77,6 +80,9 @@ class Reader : public ::testing::Test {
     ASSERT_TRUE(eventually([this] { return tools::takesConnections(port_); })) << folder_.read("nats.log");
     ASSERT_EQ(natsConnection_ConnectTo(&connection_, url().c_str()), NATS_OK);
     ASSERT_EQ(natsConnection_JetStream(&context_, connection_, nullptr), NATS_OK);
+    makeStream();
+  }
+  void makeStream() {
     jsStreamConfig stream;
     jsStreamConfig_Init(&stream);
     const char* subjects[] = {"kyt.events.*"};
@@ -108,6 +114,15 @@ class Reader : public ::testing::Test {
     const auto status = reader_.wait(std::chrono::seconds(30));
     reader_ = tools::ChildProcess();
     return status;
+  }
+  // What the reader has used.
+  [[nodiscard]] double processorSeconds() const {
+    std::ifstream file("/proc/" + std::to_string(reader_.pid()) + "/stat");
+    std::string word;
+    double ticks = 0;
+    for (int place = 1; place <= 15 && file >> word; ++place)
+      if (place >= 14) ticks += std::stod(word);
+    return ticks / static_cast<double>(sysconf(_SC_CLK_TCK));
   }
   [[nodiscard]] std::string said() const { return folder_.read("reader.log"); }
 
@@ -288,6 +303,34 @@ TEST_F(Reader, LosesAndDoublesNothingWhereItDiesOrTheDatabaseDoes) {
   }
   EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", std::to_string(kPosts)));
   EXPECT_EQ(postgres_->query("SELECT count(*), count(DISTINCT post) FROM kyt_events"), "800|400\n");
+}
+
+TEST_F(Reader, MakesItsConsumerAgainWhereItIsGone) {
+  startReader();
+  put("aa", gzipped(message(1)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "1"));
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+  ASSERT_EQ(js_DeleteConsumer(context_, "kyt-events", "kytreader", nullptr, nullptr), NATS_OK);
+  put("bb", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "2"));
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+}
+
+TEST_F(Reader, RestsBetweenItsAttemptsWhileTheStreamIsAway) {
+  startReader();
+  put("aa", gzipped(message(1)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "1"));
+  ASSERT_EQ(js_DeleteStream(context_, "kyt-events", nullptr, nullptr), NATS_OK);
+  const size_t before = said().size();
+  EXPECT_TRUE(eventually([&] { return said().size() > before; })) << said();
+  // Without a rest it takes a processor: a second of each second.
+  const auto begin = std::chrono::steady_clock::now();
+  const double used = processorSeconds();
+  EXPECT_TRUE(eventually([&] { return std::chrono::steady_clock::now() - begin > std::chrono::seconds(3); }));
+  EXPECT_LT(processorSeconds() - used, 0.5);
+  makeStream();
+  put("bb", gzipped(message(2)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "2"));
 }
 
 }  // namespace
