@@ -8,7 +8,17 @@ namespace kyt::receiver {
 
 Delivery::Delivery(EventLog& log, Spool& spool, const Clock& clock, Figures& figures, Log& lines,
                    Duration publishTime)
-    : log_(log), spool_(spool), clock_(clock), figures_(figures), lines_(lines), publishTime_(publishTime) {}
+    : log_(log),
+      spool_(spool),
+      clock_(clock),
+      figures_(figures),
+      lines_(lines),
+      publishTime_(publishTime),
+      partitions_(spool.partitions()) {}
+
+uint32_t Delivery::partitionOf(const LogMessage& message) const {
+  return receiver::partitionOf(message.id, spool_.partitions());
+}
 
 uint64_t Delivery::enter(Pending pending) {
   pending.since = clock_.monotonic();
@@ -20,7 +30,8 @@ uint64_t Delivery::enter(Pending pending) {
 }
 
 void Delivery::take(std::shared_ptr<const LogMessage> message, Done done) {
-  if (!isUp_.load(std::memory_order_relaxed) || !isTrusted_.load(std::memory_order_relaxed))
+  if (!isUp_.load(std::memory_order_relaxed) ||
+      !partitions_[partitionOf(*message)].isTrusted.load(std::memory_order_relaxed))
     return keep(std::move(message), std::move(done));
   const uint64_t token = enter({message, std::move(done)});
   log_.publish(token, std::move(message));
@@ -49,19 +60,23 @@ void Delivery::keep(std::shared_ptr<const LogMessage> message, Done done) {
   });
 }
 
-void Delivery::trust() {
-  if (!isTrusted_.load(std::memory_order_relaxed)) isTrusted_ = true;
-  if (isFailureTold_.load(std::memory_order_relaxed) && isFailureTold_.exchange(false))
-    lines_.normal("log: it takes messages again");
+void Delivery::trust(uint32_t partition) {
+  Partition& taking = partitions_[partition];
+  if (!taking.isTrusted.load(std::memory_order_relaxed)) taking.isTrusted = true;
+  if (!taking.isFailing.load(std::memory_order_relaxed) || !taking.isFailing.exchange(false)) return;
+  if (--failing_ == 0) lines_.normal("log: it takes messages again");
 }
 
-void Delivery::distrust(const char* why) {
+// Told of the first partition alone: a log that is in trouble has many.
+void Delivery::distrust(uint32_t partition, const char* why) {
+  Partition& failed = partitions_[partition];
   {
     MutexLock lock(mutex_);
-    if (isTrusted_.exchange(false)) distrustedAt_ = clock_.monotonic();
+    if (failed.isTrusted.exchange(false)) failed.distrustedAt = clock_.monotonic();
   }
-  if (!isFailureTold_.exchange(true))
-    lines_.error("log: %s; posts go to the spool until it takes messages again", why);
+  if (failed.isFailing.exchange(true) || failing_++ != 0) return;
+  lines_.error("log: %s; posts of partition %u go to the spool until it takes messages again", why,
+               partition);
 }
 
 void Delivery::refused(Pending pending) {
@@ -73,23 +88,24 @@ void Delivery::refused(Pending pending) {
 
 void Delivery::answered(Pending pending, const LogAnswer& answer) {
   const bool isReplay = !pending.done;
+  const uint32_t partition = partitionOf(*pending.message);
   switch (answer.verdict) {
     case LogVerdict::stored:
     case LogVerdict::duplicate:
       figures_.publishTime.add(clock_.monotonic() - pending.since);
       if (answer.verdict == LogVerdict::duplicate) count(figures_.duplicates);
-      trust();
+      trust(partition);
       if (isReplay) return spool_.replayed(pending.number, SpoolReplay::stored);
       return pending.done(Fate::stored);
     case LogVerdict::refusedForGood:
       count(figures_.logRefusalsForGood);
       lines_.error("log: a message is refused for good: %s", answer.text.c_str());
-      trust();
+      trust(partition);
       if (isReplay) return spool_.replayed(pending.number, SpoolReplay::never);
       return pending.done(Fate::tooLargeForLog);
     case LogVerdict::refused:
       count(figures_.logRefusals);
-      distrust(answer.text.c_str());
+      distrust(partition, answer.text.c_str());
       return refused(std::move(pending));
   }
 }
@@ -126,7 +142,7 @@ void Delivery::logIsUp(bool isUp) {
     lines_.error("log: it is not there; posts go to the spool");
   for (Pending& pending : lost) refused(std::move(pending));
   if (isUp) {
-    isTrusted_ = true;
+    for (Partition& partition : partitions_) partition.isTrusted = true;
     spool_.wake();
   }
 }
@@ -142,8 +158,11 @@ std::vector<Delivery::Pending> Delivery::takeLate(MonotonicTime now) {
     deadlines_.pop_front();
   }
   // Where no post of the spool will show that the log takes messages again, the next of a device may.
-  const bool isShown = spool_.hasReplays() && !spool_.isBroken();
-  if (!isTrusted_ && !isShown && distrustedAt_ + Limits::retryPause <= now) isTrusted_ = true;
+  for (uint32_t i = 0; i < partitions_.size(); ++i) {
+    Partition& partition = partitions_[i];
+    if (partition.isTrusted || (spool_.hasReplays(i) && !spool_.isBroken())) continue;
+    if (partition.distrustedAt + Limits::retryPause <= now) partition.isTrusted = true;
+  }
   return late;
 }
 
@@ -151,8 +170,10 @@ void Delivery::tick() {
   std::vector<Pending> late = takeLate(clock_.monotonic());
   if (late.empty()) return;
   count(figures_.logTimeouts, late.size());
-  distrust("a message was not acknowledged in time");
-  for (Pending& pending : late) refused(std::move(pending));
+  for (Pending& pending : late) {
+    distrust(partitionOf(*pending.message), "a message was not acknowledged in time");
+    refused(std::move(pending));
+  }
 }
 
 }  // namespace kyt::receiver

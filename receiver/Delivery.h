@@ -1,5 +1,6 @@
-// Where a post goes once it is found good: to the log, and where that does not acknowledge in time, to the spool. A log
-// that failed is left alone until it has taken something of the spool: posts then go there at once and need not wait.
+// Where a post goes once it is found good: to the log, and where that does not acknowledge in time, to the spool. A
+// partition of the log that failed is left alone until it has taken something of the spool: its posts then go there at once
+// and need not wait.
 // Any thread; callbacks run on threads of the log or the spool, with no lock held.
 #pragma once
 
@@ -38,6 +39,9 @@ class Delivery final : public LogListener, public Replays {
   [[nodiscard]] bool wasUp() const { return wasUp_.load(); }  // the log was there once
   [[nodiscard]] bool isUp() const { return isUp_.load(); }
   [[nodiscard]] uint64_t pending() EXCLUDES(mutex_);  // messages on their way to the log
+  [[nodiscard]] uint64_t failing() const {
+    return failing_.load();
+  }  // partitions whose posts go to the spool
 
   void logAnswered(uint64_t token, const LogAnswer& answer) override EXCLUDES(mutex_);
   void logIsUp(bool isUp) override EXCLUDES(mutex_);
@@ -51,12 +55,18 @@ class Delivery final : public LogListener, public Replays {
     int64_t number = 0;  // of one of the spool
     MonotonicTime since{};
   };
+  struct Partition {
+    std::atomic<bool> isTrusted{true};   // its last answer, or lack of one, was no failure
+    std::atomic<bool> isFailing{false};  // it failed, and has taken nothing since
+    MonotonicTime distrustedAt{};        // of mutex_
+  };
+  [[nodiscard]] uint32_t partitionOf(const LogMessage& message) const;
   [[nodiscard]] uint64_t enter(Pending pending) EXCLUDES(mutex_);
   void answered(Pending pending, const LogAnswer& answer);
   void refused(Pending pending);
   void keep(std::shared_ptr<const LogMessage> message, Done done);
-  void trust() EXCLUDES(mutex_);
-  void distrust(const char* why) EXCLUDES(mutex_);
+  void trust(uint32_t partition);
+  void distrust(uint32_t partition, const char* why) EXCLUDES(mutex_);
   [[nodiscard]] std::vector<Pending> takeLate(MonotonicTime now) EXCLUDES(mutex_);
 
   EventLog& log_;
@@ -66,13 +76,12 @@ class Delivery final : public LogListener, public Replays {
   Log& lines_;
   const Duration publishTime_;
   std::atomic<bool> isUp_{false}, wasUp_{false};
-  std::atomic<bool> isTrusted_{true};  // its last answer, or lack of one, was no failure
-  std::atomic<bool> isFailureTold_{false};
+  std::vector<Partition> partitions_;
+  std::atomic<uint64_t> failing_{0};
   Mutex mutex_;
   uint64_t lastToken_ GUARDED_BY(mutex_) = 0;
   std::unordered_map<uint64_t, Pending> pending_ GUARDED_BY(mutex_);
   std::deque<std::pair<MonotonicTime, uint64_t>> deadlines_ GUARDED_BY(mutex_);  // in their order
-  MonotonicTime distrustedAt_ GUARDED_BY(mutex_){};
 };
 
 }  // namespace kyt::receiver

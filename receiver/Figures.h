@@ -60,7 +60,8 @@ struct Figures {
   // The log: messages without an answer in time, answers that refuse one now or for good.
   Number logTimeouts{0}, logRefusals{0}, logRefusalsForGood{0};
   Histogram publishTime;
-  // The spool: posts that the log has from it, those that the log never takes, and failed changes of the file.
+  // The spool: posts that the log has from it, those that the log never takes or the disk no longer
+  // gives, and failed changes of the file or readings of a post.
   Number replayed{0}, stuck{0}, spoolFailures{0};
   Number deadLetters{0}, deadLettersLeftOut{0};
 

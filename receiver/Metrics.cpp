@@ -72,6 +72,9 @@ void writeLog(Text& out, const Figures& figures, Delivery& delivery) {
   out.sample(delivery.isUp() ? 1 : 0);
   out.gauge("kyt_log_pending", "Messages that the log has not acknowledged yet.");
   out.sample(delivery.pending());
+  out.gauge("kyt_log_failing",
+            "Partitions that failed and have taken nothing since: their posts go to the spool.");
+  out.sample(delivery.failing());
   out.counter("kyt_duplicates", "Messages that the log had already.");
   out.sample(figures.duplicates);
   out.counter("kyt_log_timeouts", "Messages that the log did not acknowledge in time.");
@@ -89,13 +92,13 @@ void writeSpool(Text& out, const Figures& figures, const Spool& spool) {
   out.sample(spool.bytes());
   out.gauge("kyt_spool_max_bytes", "Bytes that the spool may have.");
   out.sample(spool.maxBytes());
-  out.gauge("kyt_spool_oldest_seconds", "How long ago the oldest of these was kept.");
+  out.gauge("kyt_spool_oldest_seconds", "How long ago the oldest was kept that the log may take.");
   out.sample(spool.oldestSeconds());
   out.counter("kyt_spool_replayed", "Posts of the spool that the log has taken.");
   out.sample(figures.replayed);
   out.counter("kyt_spool_stuck", "Posts of the spool that the log never takes or the disk no longer gives.");
   out.sample(figures.stuck);
-  out.counter("kyt_spool_failures", "Changes of the spool's file that failed.");
+  out.counter("kyt_spool_failures", "Changes of the spool's file, and readings of a post, that failed.");
   out.sample(figures.spoolFailures);
 }
 

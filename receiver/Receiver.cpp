@@ -167,7 +167,7 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   const LinuxClock clock;
   Figures figures;
   SQLitePostStore store(settings.spoolPath);
-  Spool spool(store, settings.spoolMaxBytes, clock, figures, lines);
+  Spool spool(store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions);
   if (const auto wrong = spool.open()) return lines.error("spool: %s", wrong->c_str()), 1;
   Delivery delivery(log, spool, clock, figures, lines, settings.log.publishTime);
   DeadLetters deadLetters(log, clock, figures);

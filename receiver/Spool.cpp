@@ -27,8 +27,14 @@ uint64_t bytesOf(const LogMessage& message) {
 
 }  // namespace
 
-Spool::Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines)
-    : store_(store), maxBytes_(maxBytes), clock_(clock), figures_(figures), lines_(lines) {}
+Spool::Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
+             uint32_t partitions)
+    : store_(store),
+      maxBytes_(maxBytes),
+      clock_(clock),
+      figures_(figures),
+      lines_(lines),
+      lanes_(partitions) {}
 
 Spool::~Spool() {
   stop();
@@ -38,14 +44,13 @@ std::optional<std::string> Spool::open() {
   for (bool again : {true, false}) {
     const auto wrong = store_.open([this](StoredPostHead head) {
       if (head.isUnreadable) return count(figures_.stuck);
-      entries_[head.post.number] = {head.bytes, head.post.keptAt};
+      enter(head.post.number, {head.bytes, head.post.keptAt, partitionOf(head.post.url, partitions())});
       lastNumber_ = std::max(lastNumber_, head.post.number);
       bytes_ += head.bytes;
     });
     if (!wrong) break;
     if (wrong->kind != PostStoreProblem::Kind::damaged || !again) return wrong->text;
-    entries_.clear();
-    bytes_ = 0;
+    forgetAll();
     lines_.error("spool: %s; %s", wrong->text.c_str(), store_.setAside().c_str());
   }
   if (!entries_.empty())
@@ -143,31 +148,74 @@ Spool::Additions Spool::takeAdditions() {
 
 void Spool::takeReplies() {
   std::vector<std::pair<int64_t, SpoolReplay>> replies;
+  bool isWoken = false;
   {
     MutexLock lock(mutex_);
     replies.swap(replies_);
-    if (std::exchange(isWoken_, false)) nextReplay_ = {};
+    isWoken = std::exchange(isWoken_, false);
   }
   for (const auto& [number, result] : replies) {
     const auto known = entries_.find(number);
     if (known == entries_.end() || known->second.state != Entry::State::inFlight) continue;
+    Entry& entry = known->second;
+    Lane& lane = lanes_[entry.partition];
     --inFlight_;
-    inFlightBytes_ -= known->second.bytes;
+    --lane.inFlight;
+    inFlightBytes_ -= entry.bytes;
+    lane.inFlightBytes -= entry.bytes;
     switch (result) {
       case SpoolReplay::stored:
-        known->second.state = Entry::State::stored;
+        entry.state = Entry::State::stored;
         toRemove_.push_back(number);
+        lane.isFailing = false;
+        lane.window = std::min(2 * lane.window, Limits::maxReplayPosts);
         count(figures_.replayed);
         break;
       case SpoolReplay::failed:
-        known->second.state = Entry::State::waiting;
-        hasFailed_ = true;
+        entry.state = Entry::State::waiting;
+        lane.waiting.insert(number);
+        fail(lane);
         break;
       case SpoolReplay::never:  // it was answered as taken, so it stays for a person to look at
-        known->second.state = Entry::State::stuck;
-        count(figures_.stuck);
+        setStuck(number);
         break;
     }
+  }
+  if (isWoken)
+    for (Lane& lane : lanes_) lane.nextReplay = {}, lane.cursor = 0;
+}
+
+void Spool::enter(int64_t number, Entry entry) {
+  lanes_[entry.partition].waiting.insert(number);
+  entries_[number] = entry;
+}
+
+// The oldest is tried once more; as long as that fails too, one after another: it may be the post, not the partition.
+void Spool::fail(Lane& lane) {
+  if (!std::exchange(lane.isFailing, true)) lane.cursor = 0;
+  lane.window = 1;
+  lane.nextReplay = clock_.monotonic() + Limits::replayPause;
+}
+
+void Spool::setStuck(int64_t number) {
+  const auto known = entries_.find(number);
+  ++stuckPosts_;
+  stuckBytes_ += known->second.bytes;
+  lanes_[known->second.partition].waiting.erase(number);
+  entries_.erase(known);
+  count(figures_.stuck);
+}
+
+void Spool::forgetAll() {
+  for (const auto& [number, entry] : entries_) bytes_ -= entry.bytes;
+  bytes_ -= std::exchange(stuckBytes_, 0);
+  stuckPosts_ = 0;
+  entries_.clear();
+  toRemove_.clear();
+  inFlight_ = inFlightBytes_ = 0;
+  for (Lane& lane : lanes_) {
+    lane.waiting.clear();
+    lane.inFlight = lane.inFlightBytes = 0;
   }
 }
 
@@ -189,15 +237,13 @@ bool Spool::change(const Additions& added) {
     if (!isBroken_.exchange(true)) lines_.error("spool: %s", wrong->text.c_str());
     if (wrong->kind == PostStoreProblem::Kind::damaged) {
       lines_.error("spool: its posts are out of reach; %s", store_.setAside().c_str());
-      for (const auto& [number, entry] : entries_) bytes_ -= entry.bytes;
-      entries_.clear();
-      toRemove_.clear();
-      inFlight_ = inFlightBytes_ = 0;
+      forgetAll();
     }
     return false;
   }
   if (isBroken_.exchange(false)) lines_.normal("spool: it can be written to again");
-  for (size_t i = 0; i < added.size(); ++i) entries_[++lastNumber_] = {added[i]->bytes, now};
+  for (const auto& adding : added)
+    enter(++lastNumber_, {adding->bytes, now, partitionOf(adding->message->id, partitions())});
   forget(std::exchange(toRemove_, {}));
   return true;
 }
@@ -227,16 +273,19 @@ void Spool::tell(const Additions& added, SpoolVerdict verdict) {
   for (const auto& done : told) done(verdict);
 }
 
-std::shared_ptr<const LogMessage> Spool::read(int64_t number, Entry& entry) {
+// None: that one is stuck, or the disk gives it another time. Either way those behind it go on.
+std::shared_ptr<const LogMessage> Spool::read(int64_t number, Lane& lane) {
   auto read = store_.read(number);
-  if (const auto* wrong = std::get_if<PostStoreProblem>(&read)) {
-    lines_.error("spool: %s", wrong->text.c_str());
-    if (wrong->kind == PostStoreProblem::Kind::post) {
-      entry.state = Entry::State::stuck;
-      count(figures_.stuck);
-    } else {
-      isBroken_ = true;
-    }
+  const auto* wrong = std::get_if<PostStoreProblem>(&read);
+  lane.isUnread = wrong != nullptr && wrong->kind == PostStoreProblem::Kind::unavailable;
+  if (wrong != nullptr) {
+    count(figures_.spoolFailures);
+    if (!std::exchange(entries_.at(number).isFailureTold, true))
+      lines_.error("spool: %s", wrong->text.c_str());
+    if (lane.isUnread)
+      fail(lane);
+    else
+      setStuck(number);
     return nullptr;
   }
   auto& post = std::get<StoredPost>(read);
@@ -247,42 +296,63 @@ std::shared_ptr<const LogMessage> Spool::read(int64_t number, Entry& entry) {
   return message;
 }
 
-void Spool::replayMore(Replays& replays) {
-  if (hasFailed_) {
-    if (inFlight_ != 0) return;
-    hasFailed_ = false;
-    cursor_ = 0;
-    nextReplay_ = clock_.monotonic() + Limits::replayPause;
+// Partitions that fail get half of it all at most, so the others always go on.
+bool Spool::hasRoomFor(const Lane& lane) const {
+  if (inFlight_ >= Limits::maxReplayPosts || inFlightBytes_ >= Limits::maxReplayBytes) return false;
+  if (!lane.isFailing) return true;
+  size_t posts = 0, bytes = 0;
+  for (const Lane& other : lanes_) {
+    if (!other.isFailing) continue;
+    posts += other.inFlight;
+    bytes += other.inFlightBytes;
   }
-  if (clock_.monotonic() < nextReplay_) return;
-  for (auto next = entries_.upper_bound(cursor_); next != entries_.end(); ++next) {
-    if (inFlight_ >= Limits::maxReplayPosts || inFlightBytes_ >= Limits::maxReplayBytes) return;
-    auto& [number, entry] = *next;
-    cursor_ = number;
-    if (entry.state != Entry::State::waiting) continue;
-    if (!replays.takesReplays()) {
-      hasFailed_ = true;
-      return;
-    }
-    const auto message = read(number, entry);
-    if (!message) {
-      if (entry.state != Entry::State::waiting) continue;
-      hasFailed_ = true;
-      return;
-    }
-    entry.state = Entry::State::inFlight;
-    ++inFlight_;
-    inFlightBytes_ += entry.bytes;
-    replays.replay(number, message);
-  }
+  return posts < Limits::maxReplayPosts / 2 && bytes < Limits::maxReplayBytes / 2;
+}
+
+// False: that partition is given nothing more for now.
+bool Spool::replayNext(Lane& lane, Replays& replays, MonotonicTime now) {
+  if (lane.waiting.empty() || lane.inFlight >= lane.window || now < lane.nextReplay || !hasRoomFor(lane))
+    return false;
+  auto next = lane.waiting.upper_bound(lane.cursor);
+  if (next == lane.waiting.end()) next = lane.waiting.begin();
+  const int64_t number = *next;
+  lane.cursor = number;
+  const auto message = read(number, lane);
+  if (!message) return !lane.isUnread;
+  lane.waiting.erase(number);
+  Entry& entry = entries_.at(number);
+  entry.state = Entry::State::inFlight;
+  ++inFlight_;
+  ++lane.inFlight;
+  inFlightBytes_ += entry.bytes;
+  lane.inFlightBytes += entry.bytes;
+  replays.replay(number, message);
+  return true;
+}
+
+// One of each partition in turn.
+void Spool::replayMore(Replays& replays, MonotonicTime now) {
+  const size_t lanes = lanes_.size();
+  for (size_t idle = 0; idle < lanes; nextLane_ = (nextLane_ + 1) % lanes)
+    idle = replayNext(lanes_[nextLane_], replays, now) ? 0 : idle + 1;
 }
 
 void Spool::showFigures() {
-  posts_ = entries_.size();
+  posts_ = entries_.size() + stuckPosts_;
   oldest_ = entries_.empty() ? 0 : entries_.begin()->second.keptAt;
-  replayable_ = static_cast<uint64_t>(std::any_of(entries_.begin(), entries_.end(), [](const auto& entry) {
-    return entry.second.state == Entry::State::waiting || entry.second.state == Entry::State::inFlight;
-  }));
+  for (Lane& lane : lanes_)
+    lane.isReplayable = !lane.isUnread && (!lane.waiting.empty() || lane.inFlight != 0);
+}
+
+// When a pause ends. What waits for room goes on with a reply.
+std::optional<MonotonicTime> Spool::nextTurn(MonotonicTime now, bool takesReplays) const {
+  std::optional<MonotonicTime> due;
+  if (!toRemove_.empty()) due = now + Limits::replayPause;
+  if (!takesReplays) return due;
+  for (const Lane& lane : lanes_)
+    if (!lane.waiting.empty() && lane.inFlight < lane.window && now < lane.nextReplay)
+      due = due ? std::min(*due, lane.nextReplay) : lane.nextReplay;
+  return due;
 }
 
 std::optional<MonotonicTime> Spool::turn(Replays& replays) {
@@ -292,18 +362,17 @@ std::optional<MonotonicTime> Spool::turn(Replays& replays) {
   const bool isDone = change(added);
   showFigures();
   if (!added.empty()) tell(added, isDone ? SpoolVerdict::kept : SpoolVerdict::broken);
-  const bool isEmpty = entries_.size() == toRemove_.size();
+  const bool isEmpty = entries_.size() == toRemove_.size() && stuckPosts_ == 0;
   if (hadEntries && isEmpty) {
     // On a full disk nothing can be removed row by row; the whole file can.
     store_.becameEmpty();
     if (isDone) lines_.normal("spool: it is empty");
   }
-  replayMore(replays);
+  const MonotonicTime now = clock_.monotonic();
+  const bool takesReplays = replays.takesReplays();
+  if (takesReplays) replayMore(replays, now);
   showFigures();
-  if (!toRemove_.empty()) return clock_.monotonic() + Limits::replayPause;
-  if (hasFailed_ && inFlight_ == 0) return clock_.monotonic();
-  if (replayable_ != 0 && inFlight_ == 0) return std::max(nextReplay_, clock_.monotonic());
-  return std::nullopt;
+  return nextTurn(now, takesReplays);
 }
 
 }  // namespace kyt::receiver

@@ -1,6 +1,9 @@
 // Posts that the log did not take, on this machine's disk until it does: kept in groups, each with one fdatasync, and given
 // to the log again in their order under the IDs that they had. The disk is the outbox's port (platform/PostStore.h).
 //
+// Each of the log's partitions has a lane of its own: one that takes nothing is tried with one post after another, every
+// Limits::replayPause, while those of the others go on.
+//
 // One thread works with the disk; add(), replayed(), wake() and tick() may be called from any thread and never wait for it.
 #pragma once
 
@@ -11,6 +14,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -22,6 +26,7 @@
 #include "platform/queues/Log.h"
 #include "receiver/EventLog.h"
 #include "receiver/Figures.h"
+#include "receiver/Limits.h"
 
 namespace kyt::receiver {
 
@@ -38,8 +43,9 @@ class Replays {
 
 class Spool {
  public:
-  // All outlive this.
-  Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines);
+  // All outlive this. `partitions`: of the log, 1 at least.
+  Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
+        uint32_t partitions = 1);
   ~Spool();  // stop()
   Spool(const Spool&) = delete;
   Spool& operator=(const Spool&) = delete;
@@ -67,8 +73,9 @@ class Spool {
   [[nodiscard]] uint64_t bytes() const { return bytes_.load(); }  // those that wait for the disk included
   [[nodiscard]] uint64_t maxBytes() const { return maxBytes_; }
   [[nodiscard]] uint64_t oldestSeconds() const;  // how long ago the oldest was kept; 0: there is none
-  // Whether a post waits that will show whether the log takes messages.
-  [[nodiscard]] bool hasReplays() const { return replayable_.load() != 0; }
+  // Whether a post waits that will show whether that partition of the log takes messages.
+  [[nodiscard]] bool hasReplays(uint32_t partition) const { return lanes_.at(partition).isReplayable.load(); }
+  [[nodiscard]] uint32_t partitions() const { return static_cast<uint32_t>(lanes_.size()); }
   [[nodiscard]] bool isBroken() const { return isBroken_.load(); }  // the last change failed
 
  private:
@@ -81,7 +88,21 @@ class Spool {
   struct Entry {
     uint64_t bytes = 0;
     int64_t keptAt = 0;  // seconds since 1970
-    enum class State : uint8_t { waiting, inFlight, stored, stuck } state = State::waiting;
+    uint32_t partition = 0;
+    bool isFailureTold = false;  // that the disk does not give it
+    enum class State : uint8_t { waiting, inFlight, stored } state = State::waiting;
+  };
+  // A partition's posts. All but the flag are the spool's thread's alone.
+  struct Lane {
+    std::set<int64_t> waiting;
+    int64_t cursor =
+        0;  // what was given to the log last; the next is the one behind it, from the end on the oldest
+    size_t inFlight = 0, inFlightBytes = 0;
+    size_t window = Limits::maxReplayPosts;  // so many may be in flight
+    bool isFailing = false;                  // the last answer was a failure
+    bool isUnread = false;                   // the disk did not give its post
+    MonotonicTime nextReplay{};
+    std::atomic<bool> isReplayable{false};
   };
   using Additions = std::vector<std::shared_ptr<Adding>>;
 
@@ -92,8 +113,15 @@ class Spool {
   void noteKept(const Additions& added, int64_t first);
   void forget(const std::vector<int64_t>& removed);
   void tell(const Additions& added, SpoolVerdict verdict) EXCLUDES(mutex_);
-  void replayMore(Replays& replays);
-  [[nodiscard]] std::shared_ptr<const LogMessage> read(int64_t number, Entry& entry);
+  void enter(int64_t number, Entry entry);
+  void fail(Lane& lane);
+  void setStuck(int64_t number);
+  void forgetAll();
+  void replayMore(Replays& replays, MonotonicTime now);
+  [[nodiscard]] bool hasRoomFor(const Lane& lane) const;
+  [[nodiscard]] bool replayNext(Lane& lane, Replays& replays, MonotonicTime now);
+  [[nodiscard]] std::shared_ptr<const LogMessage> read(int64_t number, Lane& lane);
+  [[nodiscard]] std::optional<MonotonicTime> nextTurn(MonotonicTime now, bool takesReplays) const;
   void showFigures();
 
   PostStore& store_;
@@ -101,17 +129,18 @@ class Spool {
   const Clock& clock_;
   Figures& figures_;
   Log& lines_;
-  std::atomic<uint64_t> posts_{0}, bytes_{0}, replayable_{0};
+  std::atomic<uint64_t> posts_{0}, bytes_{0};
   std::atomic<int64_t> oldest_{0};
   std::atomic<bool> isBroken_{false};
 
+  std::vector<Lane> lanes_;  // by partition
+
   // The spool's thread alone.
-  std::map<int64_t, Entry> entries_;
+  std::map<int64_t, Entry> entries_;          // but for those that are stuck
+  uint64_t stuckPosts_ = 0, stuckBytes_ = 0;  // that the log never takes, or the disk does not give
   int64_t lastNumber_ = 0;
-  int64_t cursor_ = 0;  // what was given to the log last
+  size_t nextLane_ = 0;
   size_t inFlight_ = 0, inFlightBytes_ = 0;
-  bool hasFailed_ = false;  // one of those in flight: the rest is waited for, then all begins anew
-  MonotonicTime nextReplay_{};
   std::vector<int64_t> toRemove_;
 
   Mutex mutex_;

@@ -19,8 +19,9 @@ class FakePostStore : public PostStore {
     std::optional<PostStoreProblem> problem;         // what every operation meets
     std::optional<PostStoreProblem> problemForGood;  // after a change that is for good
     std::set<int64_t> unreadable;                    // these alone, while they are there
-    std::optional<size_t> readableHeads;             // open() gets no further
-    bool readsFail = false;                          // while changes go well
+    PostStoreProblem::Kind unreadableIs = PostStoreProblem::Kind::unavailable;
+    std::optional<size_t> readableHeads;  // open() gets no further
+    bool readsFail = false;               // while changes go well
     size_t changes = 0, setAside = 0;
     bool wasForGood = false;  // the last change
     bool isSetAside = false;  // something lies beside
@@ -56,7 +57,7 @@ class FakePostStore : public PostStore {
   [[nodiscard]] std::variant<StoredPost, PostStoreProblem> read(int64_t number) override {
     if (disk_->problem) return *disk_->problem;
     if (disk_->readsFail || disk_->unreadable.contains(number))
-      return PostStoreProblem{PostStoreProblem::Kind::unavailable, "I/O error"};
+      return PostStoreProblem{disk_->unreadableIs, "I/O error"};
     const auto known = disk_->posts.find(number);
     if (known == disk_->posts.end()) return PostStoreProblem{PostStoreProblem::Kind::post, "missing"};
     return known->second;

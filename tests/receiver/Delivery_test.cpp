@@ -24,7 +24,8 @@ std::shared_ptr<const LogMessage> message(const std::string& id, size_t size = 1
 // Delivery and spool without their threads: turns are taken by hand.
 class DeliveryTest : public ::testing::Test {
  protected:
-  explicit DeliveryTest(uint64_t maxBytes = 10000) : spool_(store_, maxBytes, clock_, figures_, lines_) {
+  explicit DeliveryTest(uint64_t maxBytes = 10000, uint32_t partitions = 1)
+      : spool_(store_, maxBytes, clock_, figures_, lines_, partitions) {
     EXPECT_FALSE(spool_.open());
     log_.start(delivery_);
     delivery_.logIsUp(true);
@@ -91,9 +92,7 @@ TEST_F(DeliveryTest, WhatIsSpooledGoesToTheLogUnderItsOwnIDAndInOrder) {
   EXPECT_EQ(*first, Fate::spooled);
   EXPECT_EQ(*second, Fate::spooled);
   log_.setMood(Mood::stores);
-  pass(std::chrono::seconds(1));
-  pass(std::chrono::seconds(1));
-  pass(std::chrono::seconds(1));
+  for (int i = 0; i < 4; ++i) pass(std::chrono::seconds(1));
   EXPECT_EQ(log_.stored(), (std::map<std::string, int>{{"a", 1}, {"b", 1}}));
   const auto published = log_.published();
   EXPECT_EQ(published[published.size() - 2].second, "a");
@@ -221,6 +220,159 @@ TEST_F(DeliveryTest, ADamagedSpoolIsSetAsideAndBegunAnew) {
   turn();
   EXPECT_EQ(*kept, Fate::spooled);
   EXPECT_EQ(spool_.posts(), 1U);
+}
+
+// Two partitions, of which one takes nothing: IDs that begin with an even digit are of partition 0.
+class DeliveryToPartitions : public DeliveryTest {
+ protected:
+  DeliveryToPartitions() : DeliveryTest(100000, 2) {}
+  static std::string idOf(uint32_t partition, int number) {
+    return (number < 10    ? "000000"
+            : number < 100 ? "00000"
+                           : "0000") +
+           std::to_string(number) + std::to_string(partition) + "ff";
+  }
+  void setMoodOf(uint32_t partition, Mood mood) {
+    for (int i = 0; i < 200; ++i) log_.setMoodOf(idOf(partition, i), mood);
+  }
+  // Posts of both in the spool.
+  void fillSpool() {
+    log_.setMood(Mood::refuses);
+    for (int i = 0; i < 100; ++i)
+      for (const uint32_t partition : {0U, 1U}) static_cast<void>(take(idOf(partition, i)));
+    turn();
+    ASSERT_EQ(spool_.posts(), 200U);
+    log_.setMood(Mood::stores);
+  }
+  [[nodiscard]] size_t storedOf(uint32_t partition) {
+    size_t posts = 0;
+    for (const auto& [id, times] : log_.stored()) posts += partitionOf(id, 2) == partition ? 1 : 0;
+    return posts;
+  }
+  void expectTheOthersAreStored() {
+    for (int i = 0; i < 40 && spool_.posts() != 100; ++i) pass(std::chrono::seconds(1));
+    EXPECT_EQ(storedOf(1), 100U);
+    EXPECT_EQ(storedOf(0), 0U);
+    EXPECT_EQ(*take(idOf(1, 150)), Fate::stored);
+    const auto spooled = take(idOf(0, 150));
+    turn();
+    EXPECT_EQ(*spooled, Fate::spooled) << "at once: that partition takes nothing";
+    EXPECT_EQ(delivery_.failing(), 1U);
+  }
+  void expectAllAreStoredOnceItTakesAgain() {
+    setMoodOf(0, Mood::stores);
+    for (int i = 0; i < 40 && spool_.posts() != 0; ++i) pass(std::chrono::seconds(1));
+    EXPECT_EQ(storedOf(0), 101U);
+    EXPECT_EQ(*take(idOf(0, 160)), Fate::stored);
+    EXPECT_EQ(delivery_.failing(), 0U);
+  }
+};
+
+TEST_F(DeliveryToPartitions, OneThatRefusesKeepsNoPostOfAnotherFromTheLog) {
+  fillSpool();
+  setMoodOf(0, Mood::refuses);
+  expectTheOthersAreStored();
+  expectAllAreStoredOnceItTakesAgain();
+}
+
+TEST_F(DeliveryToPartitions, OneThatIsSilentKeepsNoPostOfAnotherFromTheLog) {
+  fillSpool();
+  setMoodOf(0, Mood::isSilent);
+  expectTheOthersAreStored();
+  for (int i = 0; i < 3; ++i) pass(std::chrono::seconds(1));
+  expectAllAreStoredOnceItTakesAgain();
+}
+
+TEST_F(DeliveryToPartitions, OneThatRefusesIsTriedWithOnePostAtATime) {
+  fillSpool();
+  setMoodOf(0, Mood::refuses);
+  expectTheOthersAreStored();
+  const size_t before = log_.published().size();
+  for (int i = 0; i < 10; ++i) pass(Limits::replayPause);
+  EXPECT_LE(log_.published().size() - before, 10U);
+  EXPECT_GE(log_.published().size() - before, 4U);
+}
+
+TEST_F(DeliveryTest, OnePostThatTheLogAlwaysRefusesStopsNoOther) {
+  log_.setMood(Mood::refuses);
+  for (const char* id : {"a", "b", "c", "d"}) static_cast<void>(take(id));
+  turn();
+  log_.setMood(Mood::stores);
+  log_.setMoodOf("a", Mood::refuses);
+  for (int i = 0; i < 20; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(log_.stored(), (std::map<std::string, int>{{"b", 1}, {"c", 1}, {"d", 1}}));
+  static_cast<void>(take("e"));
+  for (int i = 0; i < 4; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(log_.stored().count("e"), 1U);
+}
+
+TEST_F(DeliveryTest, ARowOfTheSpoolThatIsDamagedCostsThatPostAlone) {
+  log_.setMood(Mood::refuses);
+  for (const char* id : {"a", "b", "c"}) static_cast<void>(take(id));
+  turn();
+  log_.setMood(Mood::stores);
+  disk_->unreadable = {1};
+  disk_->unreadableIs = PostStoreProblem::Kind::damaged;
+  for (int i = 0; i < 8; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(log_.stored(), (std::map<std::string, int>{{"b", 1}, {"c", 1}}));
+  EXPECT_EQ(figures_.stuck, 1U);
+  EXPECT_EQ(figures_.spoolFailures, 1U);
+  EXPECT_EQ(spool_.posts(), 1U);
+  EXPECT_EQ(*take("d"), Fate::stored);
+}
+
+TEST_F(DeliveryTest, ARowThatTheDiskDoesNotGiveForNowIsTriedAgainAndStopsNoOther) {
+  log_.setMood(Mood::refuses);
+  for (const char* id : {"a", "b", "c"}) static_cast<void>(take(id));
+  turn();
+  log_.setMood(Mood::stores);
+  disk_->unreadable = {1};
+  for (int i = 0; i < 8; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(log_.stored(), (std::map<std::string, int>{{"b", 1}, {"c", 1}}));
+  EXPECT_GE(figures_.spoolFailures, 2U);
+  EXPECT_EQ(sink_.count("I/O error"), 1U);
+  EXPECT_EQ(*take("d"), Fate::stored) << "that row shows nothing of the log";
+  disk_->unreadable.clear();
+  for (int i = 0; i < 4; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(log_.stored().count("a"), 1U);
+  EXPECT_EQ(spool_.posts(), 0U);
+}
+
+TEST_F(DeliveryTest, APostThatTheLogNeverTakesDoesNotMakeTheSpoolOld) {
+  log_.setMood(Mood::refuses);
+  for (const char* id : {"a", "b"}) static_cast<void>(take(id));
+  turn();
+  clock_.advance(std::chrono::seconds(100));
+  EXPECT_GE(spool_.oldestSeconds(), 100U);
+  log_.setMoodOf("a", Mood::refusesForGood);
+  for (int i = 0; i < 6; ++i) pass(std::chrono::seconds(1));
+  EXPECT_GE(spool_.oldestSeconds(), 100U) << "b waits";
+  log_.setMood(Mood::stores);
+  for (int i = 0; i < 6; ++i) pass(std::chrono::seconds(1));
+  EXPECT_EQ(spool_.oldestSeconds(), 0U);
+  EXPECT_EQ(spool_.posts(), 1U);
+  EXPECT_EQ(spool_.bytes(), PostStore::bytesOf(disk_->posts.begin()->second)) << "its room is taken";
+  EXPECT_EQ(figures_.stuck, 1U);
+}
+
+TEST_F(DeliveryTest, APostThatTheLogNeverTookIsTriedAgainAtTheNextStart) {
+  log_.setMood(Mood::refuses);
+  static_cast<void>(take("a"));
+  turn();
+  log_.setMood(Mood::refusesForGood);
+  for (int i = 0; i < 3; ++i) pass(std::chrono::seconds(1));
+  ASSERT_EQ(figures_.stuck, 1U);
+  Figures figures;
+  FakePostStore store(disk_);
+  Spool spool(store, 10000, clock_, figures, lines_);
+  EXPECT_FALSE(spool.open());
+  FakeLog log;
+  Delivery delivery(log, spool, clock_, figures, lines_, std::chrono::seconds(2));
+  log.start(delivery);
+  delivery.logIsUp(true);
+  for (int i = 0; i < 3; ++i) spool.turn(delivery);
+  EXPECT_EQ(log.stored().count("a"), 1U);
+  EXPECT_EQ(spool.posts(), 0U);
 }
 
 TEST(Partitions, AreChosenByTheIDAlone) {

@@ -1,4 +1,4 @@
-// A log in memory, which stores, refuses or is silent as the test says. Any thread.
+// A log in memory, which stores, refuses or is silent as the test says, for all messages or for some. Any thread.
 #pragma once
 
 #include <atomic>
@@ -24,7 +24,8 @@ class FakeLog final : public EventLog {
     {
       MutexLock lock(mutex_);
       published_.emplace_back(token, message->id);
-      switch (mood_.load()) {
+      const auto own = moods_.find(message->id);
+      switch (own == moods_.end() ? mood_.load() : own->second) {
         case Mood::stores:
           answer.verdict = ++stored_[message->id] > 1 ? LogVerdict::duplicate : LogVerdict::stored;
           break;
@@ -48,6 +49,11 @@ class FakeLog final : public EventLog {
   void stop() override {}
 
   void setMood(Mood mood) { mood_ = mood; }
+  // Of the message with that ID alone, whatever the log's is.
+  void setMoodOf(const std::string& id, Mood mood) {
+    MutexLock lock(mutex_);
+    moods_[id] = mood;
+  }
   [[nodiscard]] std::vector<std::pair<uint64_t, std::string>> published() {
     MutexLock lock(mutex_);
     return published_;
@@ -65,6 +71,7 @@ class FakeLog final : public EventLog {
   LogListener* listener_ = nullptr;
   std::atomic<Mood> mood_{Mood::stores};
   Mutex mutex_;
+  std::map<std::string, Mood> moods_ GUARDED_BY(mutex_);
   std::vector<std::pair<uint64_t, std::string>> published_ GUARDED_BY(mutex_);  // token, ID; in their order
   std::map<std::string, int> stored_ GUARDED_BY(mutex_);                        // how often
   std::vector<std::shared_ptr<const LogMessage>> deadLetters_ GUARDED_BY(mutex_);
