@@ -116,9 +116,12 @@ Answer PostHandler::answer(Request& request) {
   if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
   if (request.body.size() > Limits::surelyTakenBytes && !log_.maxBodyBytes())
     return refuse(Refusal::logLimitUnknown, "how large a body the log takes is not known yet");
-  if (isClosed_) return refuse(Refusal::stopping, "this receiver is about to end");
   auto later = std::make_shared<LaterReply>();
-  ++waiting_;
+  ++waiting_;  // first: whoever closes looks at it then
+  if (isClosed_) {
+    --waiting_;
+    return refuse(Refusal::stopping, "this receiver is about to end");
+  }
   // The request stays until the reply is given.
   if (checks_)
     checks_->submit([this, &request, hasDigest, later] { open(request, hasDigest, later); });

@@ -37,7 +37,7 @@ class PostHandler final : public http::HttpHandler {
   void broken(http::Request& request) override;
   // Any thread. Posts that have come whole and are not answered.
   [[nodiscard]] uint64_t waiting() const { return waiting_.load(); }
-  // From here on no post is taken any more.
+  // From here on no post is taken any more: once waiting() is 0, log and spool are given none.
   void close() { isClosed_ = true; }
 
  private:
