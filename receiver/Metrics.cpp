@@ -114,10 +114,11 @@ std::string metricsText(const MetricsSources& sources) {
   out.sample(figures.deadLetters);
   out.counter("kyt_dead_letters_left_out", "Those that were too many a second for that.");
   out.sample(figures.deadLettersLeftOut);
+  http::HttpServer* const server = sources.server;
   out.gauge("kyt_connections", "Connections of the port of posts.");
-  out.sample(sources.server != nullptr ? sources.server->connections() : 0);
+  out.sample(server != nullptr ? server->connections() : 0);
   out.gauge("kyt_bodies_bytes", "Bytes of the bodies of posts that are not yet answered.");
-  out.sample(sources.server != nullptr ? sources.server->bodiesBytes() : 0);
+  out.sample(server != nullptr ? server->bodiesBytes() : 0);
   return std::move(out).finish();
 }
 

@@ -16,7 +16,7 @@ struct MetricsSources {
   Figures& figures;
   Delivery& delivery;
   Spool& spool;
-  http::HttpServer* server = nullptr;  // of the posts; null: not open yet
+  std::atomic<http::HttpServer*> server = nullptr;  // of the posts; null: not open yet
 };
 
 [[nodiscard]] std::string metricsText(const MetricsSources& sources);

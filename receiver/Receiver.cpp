@@ -177,19 +177,20 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   http::Suspensions suspensions([] {});
 
   std::string error;
-  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings);
-  portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
-  auto server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
-  if (!server) return lines.error("start: %s", error.c_str()), 1;
-  sources.server = server.get();
-  std::unique_ptr<HttpServer> metrics;
+  std::unique_ptr<HttpServer> server, metrics;
   if (settings.metrics) {
     http::ServerOptions metricsOptions =
         serverOptions(*settings.metrics, Limits::maxMetricsConnections, settings);
     metricsOptions.threads = 1;
     metrics = HttpServer::start(metricsOptions, nullptr, metricsHandler, suspensions, error);
-    if (!metrics) return lines.error("start: %s", error.c_str()), 1;
+    if (!metrics) return lines.error("start: metrics: %s", error.c_str()), 1;
   }
+  // Last: posts come at once, and from then on nothing may fail that would leave one without an answer.
+  http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings);
+  portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
+  server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
+  if (!server) return lines.error("start: %s", error.c_str()), 1;
+  sources.server = server.get();
   spool.start(delivery);
   log.start(delivery);
   auto ticker = std::make_unique<Ticker>([&] {

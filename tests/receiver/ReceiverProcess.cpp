@@ -113,7 +113,8 @@ bool HttpConnection::isClosed(std::chrono::milliseconds timeout) {
 ReceiverProcess::ReceiverProcess(Options options) : options_(std::move(options)) {
   const std::string spool = options_.spool.empty() ? folder_ / "spool" : options_.spool;
   folder_.write("kytreceiver.toml",
-                "listen = \"127.0.0.1:" + std::to_string(options_.port) + "\"\nmetrics = \"127.0.0.1:0\"\n" +
+                "listen = \"127.0.0.1:" + std::to_string(options_.port) +
+                    "\"\nmetrics = \"127.0.0.1:" + std::to_string(options_.metricsPort) + "\"\n" +
                     options_.more + "[log]\nkind = \"" + options_.kind + "\"\nservers = " + options_.servers +
                     "\n" + options_.log + "[spool]\npath = \"" + spool +
                     "\"\nmax_bytes = " + std::to_string(options_.spoolMaxBytes) + "\n[limits]\n" +

@@ -54,7 +54,7 @@ class ReceiverProcess {
     uint64_t spoolMaxBytes = 64 << 20;
     std::string limits;  // further lines of [limits]
     std::vector<std::string> arguments;
-    uint16_t port = 0;
+    uint16_t port = 0, metricsPort = 0;
     // A program and its arguments, which run the receiver: none, or what prepares the place for it.
     std::vector<std::string> wrapper;
   };

@@ -65,6 +65,28 @@ TEST_F(ReceiverInTrouble, OpensPostsWhereItIsToldToAndRefusesBombsAndWrongJSON) 
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-gzip\"}"), 2);
 }
 
+TEST_F(ReceiverInTrouble, AMetricsPortThatIsTakenEndsTheStartInOrderThoughPostsCome) {
+  start();
+  ReceiverProcess::Options options;
+  options.servers = servers_.urlsAsToml();
+  options.port = tools::freePort();
+  options.metricsPort = receiver_->metricsPort();
+  std::atomic<bool> isOver{false};
+  std::vector<std::thread> posting;
+  for (int i = 0; i < 2; ++i)
+    posting.emplace_back([&] {
+      while (!isOver) static_cast<void>(HttpConnection(options.port).post("/v1/events", postText(1)));
+    });
+  for (int i = 0; i < 10; ++i) {
+    ReceiverProcess second(options);
+    EXPECT_FALSE(second.isReady());
+    EXPECT_EQ(second.terminate(), 1) << second.output();
+    EXPECT_NE(second.output().find("start: metrics: "), std::string::npos) << second.output();
+  }
+  isOver = true;
+  for (std::thread& thread : posting) thread.join();
+}
+
 // Sends a byte now and then until the other side ends the connection or this object ends.
 class Dribble {
  public:
