@@ -66,7 +66,8 @@ TEST_F(OutboxOnADiskOfItsOwn, LosesWhatFindsNoRoomAndDeliversTheRest) {
   }
   EXPECT_GE(flushed, 4U) << daemon_.log();
   EXPECT_LT(flushed, 60U) << "there is no such disk";
-  EXPECT_TRUE(daemon_.logged("Outbox: Its file cannot be used for now")) << daemon_.log();
+  EXPECT_TRUE(eventually([&] { return daemon_.logged("Outbox: Its file cannot be used for now"); }))
+      << daemon_.log();
   EXPECT_TRUE(eventually([&] { return closes(); }));
   const int64_t kept = booked("outbox");
   EXPECT_GT(kept, 0);
@@ -92,7 +93,8 @@ TEST_F(OutboxOnADiskOfItsOwn, GoesTheUsualWayWhereItMayNotWrite) {
   ASSERT_EQ(client.configure(), "live: httppost") << daemon_.log();
   EXPECT_TRUE(client.send(9, 1, Dictionary{{"text", "x"}}));
   EXPECT_NE(client.flush(), "flushed") << "the server's answer counts as without an outbox";
-  EXPECT_TRUE(daemon_.logged("Outbox: Its file cannot be used for now")) << daemon_.log();
+  EXPECT_TRUE(eventually([&] { return daemon_.logged("Outbox: Its file cannot be used for now"); }))
+      << daemon_.log();
   EXPECT_TRUE(eventually([&] { return closes(); }));
   EXPECT_EQ(booked("outbox"), 0);
   EXPECT_GT(booked("dropped"), 0);

@@ -40,7 +40,7 @@ class Bystander {
 
  private:
   void run() {
-    while (!ending_) {
+    while (!ending_ || posted_ <= 10) {
       URLRequest request;
       request.method = "POST";
       request.url = url_;
