@@ -38,6 +38,7 @@ class Text {
   [[nodiscard]] char Peek() const { return at_ < block_.size() ? block_[at_] : '\0'; }
   char Take() {
     const char c = Peek();
+    note(c);
     if (at_ < block_.size() && ++at_ == block_.size()) fill();
     return c;
   }
@@ -50,9 +51,24 @@ class Text {
   // All of the body was read, and nothing of it was wrong.
   [[nodiscard]] bool isAtEnd() const { return at_ == block_.size() && !problem_; }
   [[nodiscard]] const char* problem() const { return problem_; }
+  [[nodiscard]] bool isStringTooLong() const { return stringBytes_ > Limits::maxJSONStringBytes; }
 
  private:
+  // RapidJSON collects each string before it tells of it, so one that is too long ends the text.
+  void note(char c) {
+    if (!isInString_) {
+      isInString_ = c == '"';
+      stringBytes_ = 0;
+    } else if (!std::exchange(isEscaped_, c == '\\' && !isEscaped_) && c == '"') {
+      isInString_ = false;
+    } else if (++stringBytes_ > Limits::maxJSONStringBytes && !problem_) {
+      problem_ = "a string is too long";
+      block_ = {};
+      at_ = 0;
+    }
+  }
   void fill() {
+    if (problem_) return;
     before_ += block_.size();
     at_ = 0;
     if (isGzip_) return inflateMore();
@@ -84,6 +100,8 @@ class Text {
   const bool isGzip_;
   size_t at_ = 0, before_ = 0;
   uint64_t limit_ = 0;
+  size_t stringBytes_ = 0;  // of the string that is being read, as it is written
+  bool isInString_ = false, isEscaped_ = false;
   z_stream stream_{};
   bool isDone_ = false;
   const char* problem_ = nullptr;
@@ -149,7 +167,7 @@ std::optional<PostProblem> problemOfPost(std::string_view body, bool isGzip) {
   Shape shape;
   rapidjson::Reader reader;
   const rapidjson::ParseResult result = reader.Parse<kParseFlags>(text, shape);
-  if (text.problem() != nullptr) return PostProblem{true, text.problem()};
+  if (text.problem() != nullptr) return PostProblem{!text.isStringTooLong(), text.problem()};
   if (shape.problem() != nullptr) return PostProblem{false, shape.problem()};
   if (result.IsError())
     return PostProblem{false, "the JSON is malformed at byte " + std::to_string(result.Offset()) + ": " +

@@ -1,5 +1,6 @@
 // Opens a post and looks whether it is what the daemon sends: JSON with a list of flat records (docs/WIRE-HTTPS.md). Reads it
-// as it is inflated and keeps none of it, so a bomb costs no memory, and not much time. Any thread, no state.
+// as it is inflated and keeps one string of it at a time (Limits::maxJSONStringBytes), so a bomb costs little memory, and not
+// much time. Any thread, no state.
 #pragma once
 
 #include <cstdint>

@@ -46,6 +46,9 @@ struct Limits {
   static constexpr uint64_t leastInflatedBytes = uint64_t{1} << 20;
   static constexpr uint64_t maxInflatedBytes = uint64_t{128} << 20;
   static constexpr unsigned maxJSONDepth = 32;
+  // Bytes of a string of the JSON, as it is written there: it is collected in memory before it is looked at. A client's
+  // message to the daemon has 1 MiB, of which each byte may be written as six.
+  static constexpr size_t maxJSONStringBytes = size_t{8} << 20;
   static constexpr unsigned checkThreads = 2;
   // Servers, paths and keys that a configuration may name: more is a mistake.
   static constexpr size_t maxPartitions = 1024;

@@ -53,6 +53,28 @@ TEST(PostsJSON, IsRefusedWhereItIsMalformed) {
   EXPECT_EQ(problemOf(std::string("{}\0{}", 5)), "the JSON ends before the body");
 }
 
+// That gzip makes half as long.
+std::string letters(size_t count) {
+  std::string text(count, ' ');
+  uint32_t number = 1;
+  for (char& c : text) c = static_cast<char>('a' + ((number = number * 1664525 + 1013904223) >> 24) % 16);
+  return text;
+}
+
+TEST(PostsJSON, IsRefusedAsSoonAsAStringIsTooLongToBeCollected) {
+  const std::string most = letters(Limits::maxJSONStringBytes);
+  EXPECT_EQ(problemOf("{\"events\":[{\"a\":\"" + most + "\",\"" + most + "\":1}]}"), "");
+  EXPECT_EQ(problemOf("{\"events\":[{\"a\":\"" + most + "x\"}]}"), "a string is too long");
+  EXPECT_EQ(problemOf("{\"events\":[{\"" + most + "x\":1}]}"), "a string is too long") << "a key";
+  EXPECT_EQ(problemOf("{\"a\":\"\\\\\",\"b\":\"\\\"" + most + "\"}"), "a string is too long")
+      << "a quote that is escaped ends none";
+  EXPECT_EQ(problemOf("{\"a\":\"\\\\\"," + std::string(Limits::maxJSONStringBytes / 8, ' ') + "\"b\":\"" +
+                      most.substr(2) + "\\\"\"}"),
+            "");
+  // What follows is not looked at.
+  EXPECT_EQ(problemOf("{\"a\":\"" + most + "x"), "a string is too long");
+}
+
 TEST(PostsGzip, IsRefusedWhereItIsDamagedOrCutOrFollowed) {
   const std::string good = gzipped(postText(1, 5000));
   ASSERT_FALSE(problemOfPost(good, true));

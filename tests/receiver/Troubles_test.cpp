@@ -59,9 +59,10 @@ TEST_F(ReceiverInTrouble, OpensPostsWhereItIsToldToAndRefusesBombsAndWrongJSON) 
   EXPECT_EQ(post(gzipped(postText(1))), 200);
   EXPECT_EQ(post(gzipped("[1]")), 400);
   EXPECT_EQ(post(gzipped(postText(2)).substr(0, 40)), 400);
+  EXPECT_EQ(post(gzipped(R"({"events":[)" + std::string(64 << 20, ' ') + "]}")), 400);
   EXPECT_EQ(post(gzipped(R"({"events":[{"a":")" + std::string(64 << 20, 'x') + "\"}]}")), 400);
   EXPECT_EQ(view_->messages(), 1U);
-  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-json\"}"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-json\"}"), 2) << "a string that is too long";
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-gzip\"}"), 2);
 }
 
