@@ -79,7 +79,7 @@ bool looksLikeAMacro(std::string_view identifier) {
 
 std::string Scope::take(const std::string& wanted) {
   if (taken_.insert(wanted).second) return wanted;
-  const std::string base = wanted.ends_with('_') ? wanted : wanted + "_";
+  std::string base = wanted.ends_with('_') ? wanted : wanted + "_";
   if (taken_.insert(base).second) return base;
   for (size_t& number = lastNumbers_.try_emplace(base, 1).first->second;;) {
     std::string identifier = base + std::to_string(++number);
