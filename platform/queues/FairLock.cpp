@@ -61,7 +61,10 @@ void FairLock::giveBack() {
     passed_ = now;
     Waiter* next = popFirst();
     next->granted = true;
-    return next->changed.notifyOne();
+    next->changed.notifyOne();
+    // That one may have been woken for another place that is free.
+    if (firstLine_ != nullptr && free_.load(std::memory_order_relaxed) != 0) wakeFirst();
+    return;
   }
   free_.store(free_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
   wakeFirst();
