@@ -1,7 +1,9 @@
 // Posts through a real nginx whose upstream is away, configured with the lines that the fleet's guide shows: its own
 // failures must not switch back ends off, the upstream's must.
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 
+#include <filesystem>
 #include <fstream>
 #include <optional>
 #include <sstream>
@@ -10,6 +12,7 @@
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/Nginx.h"
 #include "tests/integration/TestClient.h"
+#include "tests/support/ChildProcess.h"
 #include "tests/support/TestHTTPServer.h"
 
 namespace kyt {
@@ -99,6 +102,32 @@ TEST_F(LoadBalancer, WithTheDocumentedLinesADeadUpstreamCostsOnePostAndNoBackEnd
   postTwice();
   EXPECT_EQ(lastAnswer(), "429");
   EXPECT_TRUE(secondArrived()) << daemon_.log();
+}
+
+TEST_F(LoadBalancer, WithTheDocumentedLinesAFullDiskOfItsOwnIsA429) {
+  if (!mayMountOfItsOwn()) GTEST_SKIP() << "this user may mount nothing";
+  const TemporaryFolder disk;
+  const std::string body = disk.write("body", std::string(1 << 20, 'x'));
+  const std::string said = inChildProcess([&]() -> std::string {
+    const std::string folder = disk / "small";
+    std::filesystem::create_directory(folder);
+    if (!unshareMounts() || ::mount("tmpfs", folder.c_str(), "tmpfs", 0, "size=64k,mode=0777") != 0)
+      return "no disk could be made";
+    TestHTTPServer upstream;
+    const Nginx nginx(authority_.issue(),
+                      documentedLines(upstream.url("")) + "client_body_temp_path " + folder + ";\n");
+    std::string status;
+    static_cast<void>(eventually([&] {
+      status =
+          runProgram("curl", {"-sS", "--cacert", authority_.file(), "-o", "/dev/null", "-w", "%{http_code}",
+                              "-H", "Expect:", "--data-binary", "@" + body, nginx.base() + "/v1/events"})
+              .text;
+      return !status.ends_with("000");
+    }));
+    if (nginx.errors().find("No space left on device") == std::string::npos) return "the disk was not full";
+    return status;
+  });
+  EXPECT_EQ(said, "429");
 }
 
 TEST_F(LoadBalancer, WithoutThemADeadUpstreamSwitchesTheBackEndOff) {

@@ -37,11 +37,14 @@ std::optional<std::string> siteOf(const FrontOptions& options, uint16_t port) {
   replaceAll(site, "listen 443", "listen 127.0.0.1:" + std::to_string(port));
   replaceAll(site, "/etc/nginx/kyt/certificate.pem", options.certificate);
   replaceAll(site, "/etc/nginx/kyt/key.pem", options.key);
+  const std::string example = "  server 127.0.0.1:8480";
+  const size_t first = site.find(example), end = site.find("  keepalive");
+  if (first == std::string::npos || end == std::string::npos) return std::nullopt;
+  const size_t parameters = first + example.size();
+  const std::string rest = site.substr(parameters, site.find('\n', parameters) + 1 - parameters);
   std::string servers;
   for (const uint16_t receiver : options.receivers)
-    servers += "  server 127.0.0.1:" + std::to_string(receiver) + " max_fails=1 fail_timeout=2s;\n";
-  const size_t first = site.find("  server 127.0.0.1:8480"), end = site.find("  keepalive");
-  if (first == std::string::npos || end == std::string::npos) return std::nullopt;
+    servers += "  server 127.0.0.1:" + std::to_string(receiver) + rest;
   return site.replace(first, end - first, servers);
 }
 
