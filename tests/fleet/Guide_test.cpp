@@ -31,6 +31,16 @@ TEST(FleetsGuide, HasSettingsThatTheReceiverTakes) {
   EXPECT_EQ(run.status, 0) << run.text;
 }
 
+// Neither the log nor a receiver asks whoever reaches its ports who he is.
+TEST(FleetsGuide, OpensNoPortOnEveryAddress) {
+  for (const char* kind : {"receiver", "nats"}) {
+    const std::string settings = blockOf(kind);
+    EXPECT_NE(settings.find("listen"), std::string::npos) << kind;
+    EXPECT_EQ(settings.find("0.0.0.0"), std::string::npos) << settings;
+    EXPECT_EQ(settings.find("[::]"), std::string::npos) << settings;
+  }
+}
+
 TEST(FleetsGuide, HasSettingsThatTheLogTakes) {
   if (!isInstalled("nats-server")) GTEST_SKIP() << "nats-server is not installed";
   const TemporaryFolder folder;
