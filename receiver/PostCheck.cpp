@@ -7,6 +7,7 @@
 #include "http/PostDigest.h"
 #include "http/Text.h"
 #include "platform/base/Hex.h"
+#include "platform/base/TextEscape.h"
 #include "receiver/Limits.h"
 
 namespace kyt::receiver {
@@ -19,9 +20,9 @@ std::string_view headerOf(const Request& request, std::string_view name) {
   return value != nullptr ? std::string_view(*value) : std::string_view();
 }
 
-// A header's value as a message carries it: one line of valid UTF-8, cut to its limit.
+// A header's value as a message carries it: one line of text that steers no terminal, cut to its limit.
 std::string factOf(const Request& request, std::string_view name) {
-  return http::printable(headerOf(request, name).substr(0, Limits::maxFactBytes));
+  return escapedText(headerOf(request, name).substr(0, Limits::maxFactBytes));
 }
 
 bool isIdentity(std::string_view encoding) {
@@ -94,7 +95,7 @@ std::vector<std::pair<std::string, std::string>> factsOf(const Request& request,
   facts.reserve(9);
   facts.emplace_back("Kyt-Id", id);
   facts.emplace_back("Kyt-Received", std::to_string(receivedMilliseconds));
-  facts.emplace_back("Kyt-Path", http::printable(request.path));
+  facts.emplace_back("Kyt-Path", escapedText(request.path));
   const auto add = [&](const char* name, const char* header) {
     if (std::string value = factOf(request, header); !value.empty())
       facts.emplace_back(name, std::move(value));
