@@ -13,6 +13,8 @@
 #include <string>
 #include <vector>
 
+#include "tests/receiver/NatsServer.h"
+#include "tests/receiver/ReceiverProcess.h"
 #include "tests/support/Eventually.h"
 #include "tests/support/Programs.h"
 #include "tests/support/TemporaryFolder.h"
@@ -91,6 +93,17 @@ class Reader : public ::testing::Test {
     stream.SubjectsLen = 1;
     ASSERT_TRUE(
         eventually([&] { return js_AddStream(nullptr, context_, &stream, nullptr, nullptr) == NATS_OK; }));
+  }
+  // The stream knows repeats no longer than that.
+  void forgetAfter(std::chrono::nanoseconds time) {
+    jsStreamConfig stream;
+    jsStreamConfig_Init(&stream);
+    const char* subjects[] = {"kyt.events.*"};
+    stream.Name = "kyt-events";
+    stream.Subjects = subjects;
+    stream.SubjectsLen = 1;
+    stream.Duplicates = time.count();
+    ASSERT_EQ(js_UpdateStream(nullptr, context_, &stream, nullptr, nullptr), NATS_OK);
   }
   void TearDown() override {
     if (reader_.pid() > 0) {
@@ -204,6 +217,30 @@ TEST_F(Reader, LeavesRepeatsOutByTheirID) {
   EXPECT_EQ(postgres_->query("SELECT count(*) FROM kyt_events"), "4\n");
   EXPECT_EQ(end(), 0);
   EXPECT_NE(said().find("2 posts stored, 2 repeats left out"), std::string::npos) << said();
+}
+
+// As where a post's acknowledgement was lost and the spool gives it to the log much later, or a device's outbox repeats it.
+TEST_F(Reader, HasAPostOnceThatTheLogHasTwiceSinceItHadForgottenTheFirst) {
+  forgetAfter(std::chrono::milliseconds(100));
+  receiver::ReceiverProcess::Options options;
+  options.servers = "[\"" + url() + "\"]";
+  receiver::ReceiverProcess receiver(options);
+  ASSERT_TRUE(receiver.becomesReady()) << receiver.output();
+  receiver::StreamView stream(url());
+  EXPECT_EQ(receiver.post(receiver::postText(1)).status, 200);
+  EXPECT_EQ(receiver.post(receiver::postText(1)).status, 200);
+  EXPECT_EQ(stream.messages(), 1U) << "known yet";
+  EXPECT_TRUE(eventually([&] {
+    EXPECT_EQ(receiver.post(receiver::postText(1)).status, 200);
+    return stream.messages() == 2U;
+  }));
+  EXPECT_EQ(stream.ids().size(), 1U);
+  startReader();
+  EXPECT_TRUE(eventually([this] { return unread() == 0; }));
+  EXPECT_EQ(postgres_->query("SELECT count(*) FROM kyt_posts"), "1\n");
+  EXPECT_EQ(postgres_->query("SELECT count(*) = count(DISTINCT record) FROM kyt_events"), "t\n");
+  EXPECT_EQ(end(), 0);
+  EXPECT_NE(said().find("1 posts stored, 1 repeats left out"), std::string::npos) << said();
 }
 
 TEST_F(Reader, SetsAsideWhatCannotBeReadAndGoesOn) {
