@@ -110,7 +110,6 @@ class Spool {
   [[nodiscard]] Additions takeAdditions() EXCLUDES(mutex_);
   void takeReplies() EXCLUDES(mutex_);
   [[nodiscard]] bool change(const Additions& added);
-  void noteKept(const Additions& added, int64_t first);
   void forget(const std::vector<int64_t>& removed);
   void tell(const Additions& added, SpoolVerdict verdict) EXCLUDES(mutex_);
   void enter(int64_t number, Entry entry);

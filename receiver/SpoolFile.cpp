@@ -1,0 +1,130 @@
+// The spool's file: what is added, removed and read.
+#include <algorithm>
+#include <utility>
+
+#include "receiver/Spool.h"
+
+namespace kyt::receiver {
+namespace {
+
+StoredPost storedPostOf(const LogMessage& message, int64_t number, int64_t now) {
+  StoredPost post;
+  post.number = number;
+  post.keptAt = now;
+  post.url = message.id;
+  post.headers = message.headers;
+  post.body = Data(std::string_view(message.body));
+  return post;
+}
+
+}  // namespace
+
+std::optional<std::string> Spool::open() {
+  for (bool again : {true, false}) {
+    const auto wrong = store_.open([this](StoredPostHead head) {
+      if (head.isUnreadable) return count(figures_.stuck);
+      enter(head.post.number, {head.bytes, head.post.keptAt, partitionOf(head.post.url, partitions())});
+      lastNumber_ = std::max(lastNumber_, head.post.number);
+      bytes_ += head.bytes;
+    });
+    if (!wrong) break;
+    if (wrong->kind != PostStoreProblem::Kind::damaged || !again) return wrong->text;
+    forgetAll();
+    lines_.error("spool: %s; %s", wrong->text.c_str(), store_.setAside().c_str());
+  }
+  if (!entries_.empty())
+    lines_.normal("spool: %zu posts of %llu bytes are left from before", entries_.size(),
+                  static_cast<unsigned long long>(bytes_.load()));
+  showFigures();
+  return std::nullopt;
+}
+
+void Spool::enter(int64_t number, Entry entry) {
+  lanes_[entry.partition].waiting.insert(number);
+  entries_[number] = entry;
+}
+
+void Spool::setStuck(int64_t number) {
+  const auto known = entries_.find(number);
+  ++stuckPosts_;
+  stuckBytes_ += known->second.bytes;
+  lanes_[known->second.partition].waiting.erase(number);
+  entries_.erase(known);
+  count(figures_.stuck);
+}
+
+void Spool::forgetAll() {
+  for (const auto& [number, entry] : entries_) bytes_ -= entry.bytes;
+  bytes_ -= std::exchange(stuckBytes_, 0);
+  stuckPosts_ = 0;
+  entries_.clear();
+  toRemove_.clear();
+  inFlight_ = inFlightBytes_ = 0;
+  for (Lane& lane : lanes_) {
+    lane.waiting.clear();
+    lane.inFlight = lane.inFlightBytes = 0;
+  }
+}
+
+// One change of the file: what was added, what the log has. False: nothing of it was done.
+bool Spool::change(const Additions& added) {
+  if (added.empty() && toRemove_.empty()) return true;
+  const int64_t now = clock_.timeOfDay().seconds;
+  std::vector<StoredPost> posts;
+  std::vector<const StoredPost*> pointers;
+  posts.reserve(added.size());
+  for (const auto& adding : added)
+    posts.push_back(
+        storedPostOf(*adding->message, lastNumber_ + 1 + static_cast<int64_t>(posts.size()), now));
+  pointers.reserve(posts.size());
+  for (const StoredPost& post : posts) pointers.push_back(&post);
+  const auto wrong = store_.change(pointers, toRemove_, false);
+  if (wrong) {
+    count(figures_.spoolFailures);
+    if (!isBroken_.exchange(true)) lines_.error("spool: %s", wrong->text.c_str());
+    if (wrong->kind == PostStoreProblem::Kind::damaged) {
+      lines_.error("spool: its posts are out of reach; %s", store_.setAside().c_str());
+      forgetAll();
+    }
+    return false;
+  }
+  if (isBroken_.exchange(false)) lines_.normal("spool: it can be written to again");
+  for (const auto& adding : added)
+    enter(++lastNumber_, {adding->bytes, now, partitionOf(adding->message->id, partitions())});
+  forget(std::exchange(toRemove_, {}));
+  return true;
+}
+
+void Spool::forget(const std::vector<int64_t>& removed) {
+  for (const int64_t number : removed) {
+    const auto known = entries_.find(number);
+    if (known == entries_.end()) continue;
+    bytes_ -= known->second.bytes;
+    entries_.erase(known);
+  }
+}
+
+// None: that one is stuck, or the disk gives it another time. Either way those behind it go on.
+std::shared_ptr<const LogMessage> Spool::read(int64_t number, Lane& lane) {
+  auto read = store_.read(number);
+  const auto* wrong = std::get_if<PostStoreProblem>(&read);
+  lane.isUnread = wrong != nullptr && wrong->kind == PostStoreProblem::Kind::unavailable;
+  if (wrong != nullptr) {
+    count(figures_.spoolFailures);
+    if (!std::exchange(entries_.at(number).isFailureTold, true))
+      lines_.error("spool: %s", wrong->text.c_str());
+    if (lane.isUnread)
+      fail(lane);
+    else
+      setStuck(number);
+    return nullptr;
+  }
+  auto& post = std::get<StoredPost>(read);
+  auto message = std::make_shared<LogMessage>();
+  message->id = std::move(post.url);
+  message->headers = std::move(post.headers);
+  message->body = std::string(post.body.view());
+  return message;
+}
+
+}  // namespace kyt::receiver
