@@ -64,7 +64,9 @@ void Delivery::trust(uint32_t partition) {
   Partition& taking = partitions_[partition];
   if (!taking.isTrusted.load(std::memory_order_relaxed)) taking.isTrusted = true;
   if (!taking.isFailing.load(std::memory_order_relaxed) || !taking.isFailing.exchange(false)) return;
-  if (--failing_ == 0) lines_.normal("log: it takes messages again");
+  if (--failing_ != 0) return;
+  isFullTold_ = false;
+  lines_.normal("log: it takes messages again");
 }
 
 // Told of the first partition alone: a log that is in trouble has many.
@@ -77,6 +79,13 @@ void Delivery::distrust(uint32_t partition, const char* why) {
   if (failed.isFailing.exchange(true) || failing_++ != 0) return;
   lines_.error("log: %s; posts of partition %u go to the spool until it takes messages again", why,
                partition);
+}
+
+// Whatever else is wrong with it, that passes by itself only where posts leave the log with their age.
+void Delivery::tellFull(const std::string& why) {
+  if (isFullTold_.exchange(true)) return;
+  lines_.error("log: it has no room: %s; posts go to the spool until older ones leave it or it gets more",
+               why.c_str());
 }
 
 void Delivery::refused(Pending pending) {
@@ -103,6 +112,11 @@ void Delivery::answered(Pending pending, const LogAnswer& answer) {
       trust(partition);
       if (isReplay) return spool_.replayed(pending.number, SpoolReplay::never);
       return pending.done(Fate::tooLargeForLog);
+    case LogVerdict::full:
+      count(figures_.logRefusalsFull);
+      tellFull(answer.text);
+      distrust(partition, answer.text.c_str());
+      return refused(std::move(pending));
     case LogVerdict::refused:
       count(figures_.logRefusals);
       distrust(partition, answer.text.c_str());

@@ -67,6 +67,7 @@ class Delivery final : public LogListener, public Replays {
   void keep(std::shared_ptr<const LogMessage> message, Done done);
   void trust(uint32_t partition);
   void distrust(uint32_t partition, const char* why) EXCLUDES(mutex_);
+  void tellFull(const std::string& why);
   [[nodiscard]] std::vector<Pending> takeLate(MonotonicTime now) EXCLUDES(mutex_);
 
   EventLog& log_;
@@ -78,6 +79,7 @@ class Delivery final : public LogListener, public Replays {
   std::atomic<bool> isUp_{false}, wasUp_{false};
   std::vector<Partition> partitions_;
   std::atomic<uint64_t> failing_{0};
+  std::atomic<bool> isFullTold_{false};
   Mutex mutex_;
   uint64_t lastToken_ GUARDED_BY(mutex_) = 0;
   std::unordered_map<uint64_t, Pending> pending_ GUARDED_BY(mutex_);

@@ -21,7 +21,8 @@ struct LogMessage {
 enum class LogVerdict : uint8_t {
   stored,
   duplicate,      // it was there already
-  refused,        // not now: full, without a leader, unreachable
+  refused,        // not now: without a leader, unreachable
+  full,           // not now: it has no room
   refusedForGood  // never: larger than the log takes
 };
 

@@ -57,8 +57,8 @@ struct Figures {
   Number bodyBytes{0};  // of posts that were taken
   Number digestsValid{0}, digestsAbsent{0};
   std::array<Number, static_cast<size_t>(Refusal::numberOfRefusals)> refused{};
-  // The log: messages without an answer in time, answers that refuse one now or for good.
-  Number logTimeouts{0}, logRefusals{0}, logRefusalsForGood{0};
+  // The log: messages without an answer in time, answers that refuse one now, for want of room, or for good.
+  Number logTimeouts{0}, logRefusals{0}, logRefusalsFull{0}, logRefusalsForGood{0};
   Histogram publishTime;
   // The spool: posts that the log has from it, those that the log never takes or the disk no longer
   // gives, and failed changes of the file or readings of a post.

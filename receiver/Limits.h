@@ -50,6 +50,8 @@ struct Limits {
   // message to the daemon has 1 MiB, of which each byte may be written as six.
   static constexpr size_t maxJSONStringBytes = size_t{8} << 20;
   static constexpr unsigned checkThreads = 2;
+  // Seconds that a log may be told to keep posts: ten years. More is a mistake, and the servers count nanoseconds.
+  static constexpr int64_t maxAgeSeconds = int64_t{10} * 365 * 86400;
   // Servers, paths and keys that a configuration may name: more is a mistake.
   static constexpr size_t maxPartitions = 1024;
 };

@@ -79,8 +79,9 @@ void writeLog(Text& out, const Figures& figures, Delivery& delivery) {
   out.sample(figures.duplicates);
   out.counter("kyt_log_timeouts", "Messages that the log did not acknowledge in time.");
   out.sample(figures.logTimeouts);
-  out.counter("kyt_log_refusals", "Messages that the log refused, now or for good.");
+  out.counter("kyt_log_refusals", "Messages that the log refused: for now, for want of room, or for good.");
   out.sample(figures.logRefusals, "kind", "now");
+  out.sample(figures.logRefusalsFull, "kind", "full");
   out.sample(figures.logRefusalsForGood, "kind", "for-good");
   out.histogram("kyt_publish_seconds", "Until the log acknowledged a message.", figures.publishTime);
 }

@@ -191,6 +191,9 @@ class Reading {
     section.path("credentials", log.credentials);
     section.count("replicas", log.replicas, 1, 5);
     section.count("max_bytes", log.maxBytes, 1 << 20, int64_t{1} << 60);
+    int64_t maxAge = log.maxAge.count();
+    section.count("max_age_seconds", maxAge, 0, Limits::maxAgeSeconds);
+    log.maxAge = std::chrono::seconds(maxAge);
   }
 
   static void seconds(Section& section, const char* key, std::chrono::milliseconds& into) {

@@ -30,9 +30,12 @@ struct LogSettings {
   std::string caFile;                           // of the log's servers, for TLS; empty: the system's
   std::string credentials;                      // file of credentials; empty: none
   uint64_t maxBodyBytes = 17825792;             // of the posts that come: a log that takes less is said to
-  // What --make-streams makes.
+  // What --make-streams and --update-streams make.
   int replicas = 1;
-  int64_t maxBytes = -1;  // of each stream; -1: no limit
+  int64_t maxBytes = -1;  // of the stream; -1: no limit
+  // Then a post leaves the log, whether somebody has read it or not. 0: never. Long enough for a reader that is away over a
+  // holiday, and short enough for disks.
+  std::chrono::seconds maxAge{7 * 86400};
 };
 
 enum class DigestPolicy { required, optional, none };

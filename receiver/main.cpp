@@ -26,7 +26,7 @@ struct Arguments {
   std::string readyFile;
   std::string check = "headers";
   int refuseWith = 429;
-  bool checkConfig = false, makeStreams = false;
+  bool checkConfig = false, makeStreams = false, updateStreams = false;
 };
 
 void raiseDescriptorLimit() {
@@ -46,10 +46,18 @@ int fail(const std::string& text) {
   return 1;
 }
 
-int makeStreams(const Settings& settings, Log& lines) {
+int makeStreams(const Settings& settings, bool updates, Log& lines) {
   NatsLog log(settings.log, lines);
-  if (const auto wrong = log.makeStreams()) return fail(*wrong);
-  std::printf("The streams \"%s\" and \"kyt-dead-letters\" are there.\n", settings.log.stream.c_str());
+  const StreamsMade made = log.makeStreams(updates);
+  if (made.problem) return fail(*made.problem);
+  for (const std::string& difference : made.differences)
+    std::fprintf(stderr, "kytreceiver: %s\n", difference.c_str());
+  if (!made.differences.empty())
+    return fail(
+        "nothing was changed of what is there; --update-streams does that, and what is older than "
+        "log.max_age_seconds then leaves at once");
+  std::printf("The streams \"%s\" and \"kyt-dead-letters\" are there, as the settings say.\n",
+              settings.log.stream.c_str());
   return 0;
 }
 
@@ -64,8 +72,9 @@ int run(const Settings& settings, const Arguments& arguments) {
                    : arguments.level == "error" ? LogLevel::error
                                                 : LogLevel::normal);
   const bool isKafka = settings.log.kind == LogKind::kafka;
-  if (arguments.makeStreams && isKafka) return fail("topics are made with the tools of their servers");
-  if (arguments.makeStreams) return makeStreams(settings, lines);
+  const bool makesStreams = arguments.makeStreams || arguments.updateStreams;
+  if (makesStreams && isKafka) return fail("topics are made with the tools of their servers");
+  if (makesStreams) return makeStreams(settings, arguments.updateStreams, lines);
   ReceiverOptions options;
   options.posts.refuseWith = static_cast<unsigned>(arguments.refuseWith);
   options.posts.opensPosts = arguments.check == "full";
@@ -90,7 +99,9 @@ int main(int argc, char** argv) {
   commandLine.option("--config", arguments.config, "The settings").showsDefault();
   commandLine.flag("--check-config", arguments.checkConfig, "Say what is wrong with the settings, and end");
   commandLine.flag("--make-streams", arguments.makeStreams,
-                   "Make the streams that are missing in the log, and end");
+                   "Make the streams that are missing in the log, say what differs of the others, and end");
+  commandLine.flag("--update-streams", arguments.updateStreams,
+                   "The same, but change the others too: what is too old leaves at once");
   commandLine
       .option("--check", arguments.check,
               "What is looked at of each post; full: it is opened, and its JSON must be good")

@@ -12,7 +12,6 @@
 namespace kyt::receiver {
 namespace {
 
-constexpr char kDeadSubject[] = "kyt.dead", kDeadStream[] = "kyt-dead-letters";
 constexpr int64_t kConnectMilliseconds = 2000;
 constexpr int64_t kReconnectMilliseconds = 250;
 // A write that the server does not take ends the connection, and another server is tried.
@@ -21,8 +20,6 @@ constexpr std::chrono::milliseconds kAskAgain(500);
 constexpr std::chrono::seconds kEndTime(5);
 // Of a message's size, for its headers.
 constexpr int64_t kHeaderRoom = 8192;
-constexpr int64_t kDeadBytes = int64_t{1} << 30;
-constexpr int64_t kDuplicateWindow = int64_t{600} * 1000 * 1000 * 1000;  // nanoseconds
 
 std::string textOf(natsStatus status) {
   return natsStatus_GetText(status);
@@ -44,6 +41,14 @@ std::string_view memberOf(std::string_view json, std::string_view key) {
     return json.substr(0, json.find('"'));
   }
   return json.substr(0, json.find_first_of(",}"));
+}
+
+// The stream, or what its servers or its account may have on their disks, is full.
+bool isFull(std::string_view code, std::string_view text) {
+  constexpr std::string_view kAccount = "10002", kServers = "10023", kMemory = "10028", kDisk = "10047",
+                             kStream = "10077";
+  if (code == kStream) return text.find("maximum") != text.npos || text.find("no space") != text.npos;
+  return code == kAccount || code == kServers || code == kMemory || code == kDisk;
 }
 
 std::string_view dataOf(natsMsg* message) {
@@ -267,11 +272,32 @@ void NatsLog::takeStreamNames(std::string_view json) {
   if (json.find("[\"" + settings_.stream) != std::string_view::npos) {
     isMissingTold_ = false;
     hasStream_ = true;
+    askForRetention(memberOf(json, "\"streams\":["));
     return setUp(true);
   }
   if (!isMissingTold_.exchange(true))
     lines_.error("log: no stream \"%s\" takes \"%s\"; kytreceiver --make-streams makes it",
                  settings_.stream.c_str(), eventSubject("0").c_str());
+}
+
+void NatsLog::askForRetention(std::string_view stream) {
+  static_cast<void>(natsConnection_PublishRequest(connection_.get(),
+                                                  ("$JS.API.STREAM.INFO." + std::string(stream)).c_str(),
+                                                  (inbox_ + "info").c_str(), "", 0));
+}
+
+// One that was made by hand, by other settings or by an earlier version: what differs of it is told, and stays.
+void NatsLog::takeStreamInfo(std::string_view json) {
+  const std::string_view age = memberOf(json, "\"max_age\":"), name = memberOf(json, "\"name\":");
+  int64_t nanoseconds = -1;
+  if (std::from_chars(age.data(), age.data() + age.size(), nanoseconds).ec != std::errc()) return;
+  const int64_t seconds = nanoseconds / 1'000'000'000;
+  if (seconds == settings_.maxAge.count() || isRetentionTold_.exchange(true)) return;
+  lines_.error(
+      "log: the stream \"%s\" keeps posts for %lld seconds (0: for ever, until it takes no more), by "
+      "log.max_age_seconds %lld; kytreceiver --update-streams changes that",
+      escapedText(name).c_str(), static_cast<long long>(seconds),
+      static_cast<long long>(settings_.maxAge.count()));
 }
 
 void NatsLog::onMessage(natsConnection* /*connection*/, natsSubscription* /*subscription*/, natsMsg* message,
@@ -282,6 +308,7 @@ void NatsLog::onMessage(natsConnection* /*connection*/, natsSubscription* /*subs
   if (name.size() <= log.inbox_.size()) return;
   name.remove_prefix(log.inbox_.size());
   if (name == "names") return log.takeStreamNames(dataOf(message));
+  if (name == "info") return log.takeStreamInfo(dataOf(message));
   uint64_t token = 0;
   const auto [end, error] = std::from_chars(name.data(), name.data() + name.size(), token);
   if (error == std::errc() && end == name.data() + name.size()) log.takeAcknowledgement(token, message);
@@ -295,7 +322,9 @@ void NatsLog::takeAcknowledgement(uint64_t token, natsMsg* message) {
     const std::string_view code = memberOf(json, "\"err_code\":");
     const std::string_view text = memberOf(json, "\"description\":");
     constexpr std::string_view kTooLarge = "10054";
-    const LogVerdict verdict = code == kTooLarge ? LogVerdict::refusedForGood : LogVerdict::refused;
+    const LogVerdict verdict = code == kTooLarge    ? LogVerdict::refusedForGood
+                               : isFull(code, text) ? LogVerdict::full
+                                                    : LogVerdict::refused;
     return listener_->logAnswered(token, {verdict, escapedText(text) + " (" + escapedText(code) + ")"});
   }
   if (!memberOf(json, "\"stream\":").starts_with(settings_.stream))
@@ -328,33 +357,13 @@ void NatsLog::write(const Item& item) {
   listener_->logAnswered(item.token, {verdict, textOf(status)});
 }
 
-std::optional<std::string> NatsLog::makeStreams() {
-  if (!connect()) return "cannot connect: " + toldProblem_;
+StreamsMade NatsLog::makeStreams(bool updates) {
+  if (!connect()) return {"cannot connect: " + toldProblem_, {}};
   jsCtx* context = nullptr;
-  natsStatus status = natsConnection_JetStream(&context, connection_.get(), nullptr);
+  const natsStatus status = natsConnection_JetStream(&context, connection_.get(), nullptr);
   const Owned<jsCtx> owned(context);
-  if (status != NATS_OK) return textOf(status);
-  const auto make = [&](const char* name, const char* subject, int64_t maxBytes, jsDiscardPolicy discard) {
-    jsStreamConfig config;
-    jsStreamConfig_Init(&config);
-    config.Name = name;
-    config.Subjects = &subject;
-    config.SubjectsLen = 1;
-    config.Replicas = settings_.replicas;
-    config.MaxBytes = maxBytes;
-    config.Discard = discard;
-    config.Duplicates = kDuplicateWindow;
-    constexpr auto kNameInUse = static_cast<jsErrCode>(10058);
-    jsErrCode code{};
-    const natsStatus made = js_AddStream(nullptr, context, &config, nullptr, &code);
-    return made == NATS_OK || code == kNameInUse ? NATS_OK : made;
-  };
-  status = make(settings_.stream.c_str(), "kyt.events.*", settings_.maxBytes, js_DiscardNew);
-  if (status == NATS_OK) status = make(kDeadStream, kDeadSubject, kDeadBytes, js_DiscardOld);
-  if (status == NATS_OK) return std::nullopt;
-  std::string text = textOf(status);
-  if (const char* last = nats_GetLastError(nullptr); last != nullptr) text += std::string(": ") + last;
-  return text;
+  if (status != NATS_OK) return {textOf(status), {}};
+  return receiver::makeStreams(context, settings_, updates);
 }
 
 }  // namespace kyt::receiver

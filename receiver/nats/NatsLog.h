@@ -22,6 +22,7 @@
 #include "platform/queues/Log.h"
 #include "receiver/EventLog.h"
 #include "receiver/Settings.h"
+#include "receiver/nats/NatsStreams.h"
 
 namespace kyt::receiver {
 
@@ -38,8 +39,8 @@ class NatsLog final : public EventLog {
   [[nodiscard]] std::optional<uint64_t> maxBodyBytes() const override;
   void stop() override EXCLUDES(mutex_);
 
-  // Makes the two streams, or says why that failed; nothing happens to one that is there. Blocks; without start().
-  [[nodiscard]] std::optional<std::string> makeStreams();
+  // See NatsStreams.h. Blocks; without start().
+  [[nodiscard]] StreamsMade makeStreams(bool updates);
 
  private:
   static constexpr uint64_t kUnknown = ~uint64_t{0};
@@ -79,6 +80,8 @@ class NatsLog final : public EventLog {
   [[nodiscard]] natsStatus publish(const Item& item);
   void askForStream();
   void takeStreamNames(std::string_view json);
+  void askForRetention(std::string_view stream);
+  void takeStreamInfo(std::string_view json);
   void takeAcknowledgement(uint64_t token, natsMsg* message);
   void setUp(bool isUp) EXCLUDES(upMutex_);
 
@@ -91,7 +94,7 @@ class NatsLog final : public EventLog {
   std::atomic<uint64_t> maxBodyBytes_{kUnknown};
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
-  std::atomic<bool> isMissingTold_{false};
+  std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false};
   std::thread thread_;
 
   Mutex upMutex_;  // held while the listener is told, so that it is told in order

@@ -30,9 +30,13 @@ struct Wanted {
 Wanted wantedOf(const LogSettings& settings, const char* name, const char* subject, int64_t maxBytes,
                 jsDiscardPolicy discard) {
   const int64_t age = settings.maxAge.count() * kNanoseconds;
-  return {
-      name, subject, maxBytes, discard, age, age == 0 ? kDuplicateWindow : std::min(age, kDuplicateWindow),
-      settings.replicas};
+  return {name,
+          subject,
+          maxBytes,
+          discard,
+          age,
+          age == 0 ? kDuplicateWindow : std::min(age, kDuplicateWindow),
+          settings.replicas};
 }
 
 void apply(const Wanted& wanted, jsStreamConfig& config) {
@@ -53,12 +57,11 @@ std::string bytesText(int64_t bytes) {
 
 void compare(const Wanted& wanted, const jsStreamConfig& is, std::vector<std::string>& differences) {
   const auto differs = [&](const char* what, const std::string& has, const std::string& should) {
-    differences.push_back("The stream \"" + std::string(wanted.name) + "\" " + what + " " + has + "; by the settings " +
-                          should + ".");
+    differences.push_back("The stream \"" + std::string(wanted.name) + "\" " + what + " " + has +
+                          "; by the settings " + should + ".");
   };
   if (is.MaxAge != wanted.maxAge) differs("keeps posts", secondsText(is.MaxAge), secondsText(wanted.maxAge));
-  if (is.MaxBytes != wanted.maxBytes)
-    differs("takes", bytesText(is.MaxBytes), bytesText(wanted.maxBytes));
+  if (is.MaxBytes != wanted.maxBytes) differs("takes", bytesText(is.MaxBytes), bytesText(wanted.maxBytes));
   if (is.Replicas != wanted.replicas)
     differs("has copies:", std::to_string(is.Replicas), std::to_string(wanted.replicas));
   if (is.Duplicates != wanted.window)

@@ -29,6 +29,7 @@ TEST(ReceiverSettings, HaveDefaultsForAllButLogSpoolAndPath) {
   EXPECT_EQ(settings.log.stream, "kyt-events");
   EXPECT_EQ(settings.log.partitions, 1U);
   EXPECT_EQ(settings.log.publishTime, std::chrono::seconds(2));
+  EXPECT_EQ(settings.log.maxAge, std::chrono::hours(7 * 24));
   EXPECT_EQ(settings.spoolMaxBytes, 1073741824U);
   EXPECT_EQ(settings.maxBodyBytes, 17825792U);
   EXPECT_EQ(settings.bodyTime, std::chrono::seconds(60));
@@ -51,6 +52,7 @@ ca_file = "/etc/ca.pem"
 credentials = "/etc/creds"
 replicas = 3
 max_bytes = 1073741824
+max_age_seconds = 86400
 [spool]
 path = "/s"
 max_bytes = 2097152
@@ -77,6 +79,7 @@ digest = "optional"
   EXPECT_EQ(settings.log.stream, "other");
   EXPECT_EQ(settings.log.partitions, 12U);
   EXPECT_EQ(settings.log.publishTime, std::chrono::milliseconds(500));
+  EXPECT_EQ(settings.log.maxAge, std::chrono::hours(24));
   EXPECT_EQ(settings.log.caFile + settings.log.credentials, "/etc/ca.pem/etc/creds");
   EXPECT_EQ(settings.log.replicas, 3);
   EXPECT_EQ(settings.log.maxBytes, 1073741824);
