@@ -123,13 +123,15 @@ TEST_F(HTTPSPostBackendThreads, OfManyLargeBatchesAsManyAreCompressedAtATimeAsTh
     backends.push_back(backend_);
   }
   std::atomic<int> compressing{0}, most{0}, flushed{0};
+  std::atomic<bool> haveAllCome{false};
   WorkerPool pool(WorkerPoolOptions{});
   platform_.deflate.faults.beforeFinish = [&] {
     const int now = ++compressing;
     if (now > most) most = now;
     // All others have had the time to come here too.
-    if (flushed == 0) {
+    if (!haveAllCome) {
       EXPECT_TRUE(eventually([&] { return pool.figures().blocked == static_cast<size_t>(kBackends); }));
+      haveAllCome = true;
     }
     --compressing;
   };
