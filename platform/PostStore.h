@@ -80,6 +80,8 @@ class PostStore {
   virtual void becameEmpty() = 0;
   // What is there is put beside, for a person to look at, and the next change begins anew. Its text: what was done.
   [[nodiscard]] virtual std::string setAside() = 0;
+  // Files that lie beside it. Any thread.
+  [[nodiscard]] virtual uint64_t filesAside() const = 0;
   // What was put aside is gone, if there was any, and if it was last written before that time (seconds since 1970). False: it
   // cannot be removed.
   [[nodiscard]] virtual bool removeSetAside(int64_t before) = 0;

@@ -101,6 +101,9 @@ void writeSpool(Text& out, const Figures& figures, const Spool& spool) {
   out.sample(figures.stuck);
   out.counter("kyt_spool_failures", "Changes of the spool's file, and readings of a post, that failed.");
   out.sample(figures.spoolFailures);
+  out.gauge("kyt_spool_damaged_files",
+            "Files of the spool that were damaged and lie beside it, with posts that were answered.");
+  out.sample(spool.damagedFiles());
 }
 
 }  // namespace

@@ -166,7 +166,7 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   if (folder.get() < 0) return 1;
   const LinuxClock clock;
   Figures figures;
-  SQLitePostStore store(settings.spoolPath);
+  SQLitePostStore store(settings.spoolPath, "libsqlite3.so.0", SQLitePostStore::Aside::each);
   Spool spool(store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions);
   if (const auto wrong = spool.open()) return lines.error("spool: %s", wrong->c_str()), 1;
   Delivery delivery(log, spool, clock, figures, lines, settings.log.publishTime);

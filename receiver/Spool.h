@@ -76,7 +76,8 @@ class Spool {
   // Whether a post waits that will show whether that partition of the log takes messages.
   [[nodiscard]] bool hasReplays(uint32_t partition) const { return lanes_.at(partition).isReplayable.load(); }
   [[nodiscard]] uint32_t partitions() const { return static_cast<uint32_t>(lanes_.size()); }
-  [[nodiscard]] bool isBroken() const { return isBroken_.load(); }  // the last change failed
+  [[nodiscard]] uint64_t damagedFiles() const { return store_.filesAside(); }  // that lie beside it
+  [[nodiscard]] bool isBroken() const { return isBroken_.load(); }             // the last change failed
 
  private:
   struct Adding {
@@ -115,6 +116,7 @@ class Spool {
   void enter(int64_t number, Entry entry);
   void fail(Lane& lane);
   void setStuck(int64_t number);
+  void setAside(const std::string& why);
   void forgetAll();
   void replayMore(Replays& replays, MonotonicTime now);
   [[nodiscard]] bool hasRoomFor(const Lane& lane) const;

@@ -29,8 +29,7 @@ std::optional<std::string> Spool::open() {
     });
     if (!wrong) break;
     if (wrong->kind != PostStoreProblem::Kind::damaged || !again) return wrong->text;
-    forgetAll();
-    lines_.error("spool: %s; %s", wrong->text.c_str(), store_.setAside().c_str());
+    setAside(wrong->text);
   }
   if (!entries_.empty())
     lines_.normal("spool: %zu posts of %llu bytes are left from before", entries_.size(),
@@ -51,6 +50,15 @@ void Spool::setStuck(int64_t number) {
   lanes_[known->second.partition].waiting.erase(number);
   entries_.erase(known);
   count(figures_.stuck);
+}
+
+void Spool::setAside(const std::string& why) {
+  count(figures_.spoolFailures);
+  const size_t posts = entries_.size() + stuckPosts_;
+  forgetAll();
+  const std::string what = posts == 0 ? "what was in it" : "its " + std::to_string(posts) + " posts";
+  lines_.error("spool: %s; %s; %s devices think delivered: see A DAMAGED SPOOL in kytreceiver(8)",
+               why.c_str(), store_.setAside().c_str(), what.c_str());
 }
 
 void Spool::forgetAll() {
@@ -80,11 +88,12 @@ bool Spool::change(const Additions& added) {
   for (const StoredPost& post : posts) pointers.push_back(&post);
   const auto wrong = store_.change(pointers, toRemove_, false);
   if (wrong) {
-    count(figures_.spoolFailures);
-    if (!isBroken_.exchange(true)) lines_.error("spool: %s", wrong->text.c_str());
+    const bool isNew = !isBroken_.exchange(true);
     if (wrong->kind == PostStoreProblem::Kind::damaged) {
-      lines_.error("spool: its posts are out of reach; %s", store_.setAside().c_str());
-      forgetAll();
+      setAside(wrong->text);
+    } else {
+      count(figures_.spoolFailures);
+      if (isNew) lines_.error("spool: %s", wrong->text.c_str());
     }
     return false;
   }

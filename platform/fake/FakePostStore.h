@@ -70,6 +70,7 @@ class FakePostStore : public PostStore {
     disk_->problem.reset();
     return "set aside";
   }
+  [[nodiscard]] uint64_t filesAside() const override { return disk_->setAside; }
   [[nodiscard]] bool removeSetAside(int64_t before) override {
     if (disk_->keepsSetAside) return false;
     if (before > disk_->setAsideAt) disk_->isSetAside = false;

@@ -216,6 +216,9 @@ TEST_F(DeliveryTest, ADamagedSpoolIsSetAsideAndBegunAnew) {
   turn();
   EXPECT_EQ(*broken, Fate::spoolBroken);
   EXPECT_EQ(disk_->setAside, 1U);
+  EXPECT_EQ(spool_.damagedFiles(), 1U);
+  EXPECT_EQ(figures_.spoolFailures, 1U);
+  EXPECT_TRUE(sink_.contains("its 1 posts devices think delivered"));
   const auto kept = take("c");
   turn();
   EXPECT_EQ(*kept, Fate::spooled);

@@ -19,7 +19,6 @@ namespace {
 
 using Kind = PostStoreProblem::Kind;
 
-constexpr char kAside[] = ".damaged";
 // A note of this file alone: its pages that hold nothing are overwritten.
 constexpr char kIsClean[] = "SELECT value FROM notes WHERE name = 3";
 constexpr off_t kWorthGivingBack = 1 << 20;  // bytes
@@ -30,8 +29,8 @@ constexpr unsigned kMostFailedChanges = 10;
 
 }  // namespace
 
-SQLitePostStore::SQLitePostStore(std::string folder, const char* library)
-    : file_(std::move(folder) + "/outbox.sqlite"), libraryName_(library) {}
+SQLitePostStore::SQLitePostStore(std::string folder, const char* library, Aside aside)
+    : file_(std::move(folder) + "/outbox.sqlite"), libraryName_(library), aside_(aside) {}
 
 SQLitePostStore::~SQLitePostStore() {
   SQLitePostStore::close();
@@ -272,23 +271,6 @@ void SQLitePostStore::removeFile() {
   close();
   static_cast<void>(::unlink(file_.c_str()));
   static_cast<void>(::unlink((file_ + "-wal").c_str()));
-}
-
-bool SQLitePostStore::removeSetAside(int64_t before) {
-  const std::string aside = file_ + kAside;
-  struct stat status {};
-  if (::lstat(aside.c_str(), &status) != 0) return errno == ENOENT;
-  return status.st_mtime >= before || ::unlink(aside.c_str()) == 0;
-}
-
-std::string SQLitePostStore::setAside() {
-  close();
-  const std::string aside = file_ + kAside;
-  static_cast<void>(::unlink((file_ + "-wal").c_str()));
-  if (std::rename(file_.c_str(), aside.c_str()) == 0) return "it is " + aside + " now";
-  const std::string why = errorText(errno);
-  if (::unlink(file_.c_str()) == 0) return "it is removed, since it cannot be renamed: " + why;
-  return "it can be neither renamed nor removed: " + why;
 }
 
 }  // namespace kyt

@@ -1,4 +1,4 @@
-// The outbox's posts in one file of SQLite, "outbox.sqlite", readable by the daemon's user alone. A write-ahead log, and
+// Posts in one file of SQLite, "outbox.sqlite", readable by the process's user alone: the outbox's, and a receiver's spool. A write-ahead log, and
 // each change on the disk before it returns (synchronous=FULL). The daemon has the file for itself, so SQLite needs no
 // file of shared memory. An empty outbox of more than a MiB has its file removed.
 //
@@ -25,8 +25,12 @@ namespace kyt {
 class SQLitePostStore final : public PostStore {
  public:
   static constexpr int kVersion = 2;
-  // The folder is there, and the daemon may write to it. `library`: for tests.
-  explicit SQLitePostStore(std::string folder, const char* library = "libsqlite3.so.0");
+  // What setAside() does. Last: the file is "outbox.sqlite.damaged", in place of the one before, and its log is gone. Each: with
+  // its log, which has what was kept last, beside those before ("outbox.sqlite.damaged.2" and so on); no byte of them is lost.
+  enum class Aside { last, each };
+  // The folder is there, and the process may write to it. `library`: for tests.
+  explicit SQLitePostStore(std::string folder, const char* library = "libsqlite3.so.0",
+                           Aside aside = Aside::last);
   ~SQLitePostStore() override;
   SQLitePostStore(const SQLitePostStore&) = delete;
   SQLitePostStore& operator=(const SQLitePostStore&) = delete;
@@ -41,6 +45,7 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] std::optional<PostStoreProblem> setNote(Note name, int64_t value) override;
   void becameEmpty() override;
   [[nodiscard]] std::string setAside() override;
+  [[nodiscard]] uint64_t filesAside() const override;
   [[nodiscard]] bool removeSetAside(int64_t before) override;
   void close() override;
 
@@ -48,6 +53,7 @@ class SQLitePostStore final : public PostStore {
 
  private:
   using Problem = std::optional<PostStoreProblem>;
+  [[nodiscard]] std::string setAsideWithLog();
   [[nodiscard]] Problem begin();  // opens the file, and makes it
   [[nodiscard]] Problem makeFile();
   [[nodiscard]] Problem openFile();
@@ -85,6 +91,7 @@ class SQLitePostStore final : public PostStore {
 
   const std::string file_;
   const char* const libraryName_;
+  const Aside aside_;
   std::optional<SQLiteLibrary> sqlite_;
   sqlite3* database_ = nullptr;
   sqlite3_stmt *insert_ = nullptr, *delete_ = nullptr, *select_ = nullptr, *mark_ = nullptr;

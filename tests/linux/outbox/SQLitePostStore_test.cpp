@@ -216,6 +216,60 @@ TEST_F(SQLitePostStoreTest, SetsAsideAFileThatIsNone) {
   EXPECT_EQ(std::filesystem::file_size(folder_ / "outbox.sqlite.damaged"), 8192U);
 }
 
+class SQLitePostStoreThatKeepsEach : public SQLitePostStoreTest {
+ protected:
+  void copy(const char* from, const char* to) const {
+    std::filesystem::copy_file(folder_ / from, folder_ / to,
+                               std::filesystem::copy_options::overwrite_existing);
+  }
+  // A file of which that post is in the log alone, and whose beginning is damaged.
+  void makeDamagedFile(int64_t number) const {
+    {
+      SQLitePostStore store(folder_.path());
+      ASSERT_FALSE(add(store, somePost(number)));
+      copy("outbox.sqlite", "copy");
+      copy("outbox.sqlite-wal", "copy-wal");
+    }
+    copy("copy", "outbox.sqlite");
+    copy("copy-wal", "outbox.sqlite-wal");
+    std::fstream(file(), std::ios::in | std::ios::out | std::ios::binary) << "X";
+  }
+  void setAside(const std::string& name) const {
+    SQLitePostStore store(folder_.path(), "libsqlite3.so.0", SQLitePostStore::Aside::each);
+    std::optional<PostStoreProblem> problem;
+    EXPECT_TRUE(numbersIn(store, &problem).empty());
+    ASSERT_TRUE(problem);
+    ASSERT_EQ(problem->kind, Kind::damaged);
+    EXPECT_NE(store.setAside().find(name), std::string::npos);
+    EXPECT_TRUE(numbersIn(store).empty()) << "nothing of it is in the new one";
+  }
+  // Once what is damaged of it is mended.
+  void expectHasPost(const std::string& name, int64_t number) const {
+    const TemporaryFolder other;
+    std::filesystem::copy_file(folder_ / name, other / "outbox.sqlite");
+    std::filesystem::copy_file(folder_ / (name + "-wal"), other / "outbox.sqlite-wal");
+    std::fstream(other / "outbox.sqlite", std::ios::in | std::ios::out | std::ios::binary) << "S";
+    SQLitePostStore store(other.path());
+    EXPECT_EQ(numbersIn(store), std::vector<int64_t>({number}));
+    auto read = store.read(number);
+    ASSERT_TRUE(std::holds_alternative<StoredPost>(read));
+    expectSame(std::get<StoredPost>(read), somePost(number));
+  }
+};
+
+TEST_F(SQLitePostStoreThatKeepsEach, SetsAsideFileAndLogAndOverwritesNone) {
+  makeDamagedFile(1);
+  setAside("outbox.sqlite.damaged");
+  makeDamagedFile(2);
+  setAside("outbox.sqlite.damaged.2");
+  makeDamagedFile(3);
+  setAside("outbox.sqlite.damaged.3");
+  EXPECT_EQ(SQLitePostStore(folder_.path()).filesAside(), 3U);
+  expectHasPost("outbox.sqlite.damaged", 1);
+  expectHasPost("outbox.sqlite.damaged.2", 2);
+  expectHasPost("outbox.sqlite.damaged.3", 3);
+}
+
 TEST_F(SQLitePostStoreTest, FindsEveryByteThatIsNotAsItWas) {
   {
     SQLitePostStore store(folder_.path());
