@@ -28,7 +28,7 @@ struct Request {
   std::string method, path;
   std::vector<Header> headers;
   std::vector<Header> arguments;  // of the query, decoded
-  std::string body;               // empty when it was too large
+  std::string body;               // of one that was refused or too large its beginning at most
   uint64_t bodySize = 0;          // bytes that came, kept or not
   std::optional<uint64_t> contentLength;
   bool secure = false;
@@ -76,14 +76,14 @@ using Answer = std::variant<Reply, Wait, std::shared_ptr<StreamQueue>, std::shar
 class HttpHandler {
  public:
   virtual ~HttpHandler() = default;
-  // The headers are there: a reply to give at once, upon which the connection ends, whatever of the body is still to
-  // come. None: the body is waited for.
-  [[nodiscard]] virtual std::optional<Reply> refusal(const Request& /*request*/) const {
-    return std::nullopt;
-  }
+  // The headers are there. True: answer() gives a reply, whatever the body is. The body is read all the same, within
+  // ServerOptions::maxDrainBytes, for whoever is still writing may overlook what is answered before.
+  [[nodiscard]] virtual bool isRefused(const Request& /*request*/) const { return false; }
+  // Of a body that is refused or too large so many bytes of its beginning are kept.
+  [[nodiscard]] virtual uint64_t sampleBytes() const { return 0; }
   // The most bytes of body to be kept for this request (whose headers are there).
   [[nodiscard]] virtual uint64_t bodyLimit(const Request& request) const = 0;
-  // Called once, when the body is whole, too large or too slow.
+  // Called once, when the body is whole, too large or too slow, or need not be waited for.
   [[nodiscard]] virtual Answer answer(Request& request) = 0;
   // The connection ended before the body was whole; nothing can be answered.
   virtual void broken(Request& request) = 0;

@@ -117,7 +117,8 @@ class HttpServer::Exchange {
     }
     limit_ = server.handler_.bodyLimit(request_);
     request_.tooLarge = request_.contentLength && *request_.contentLength > limit_;
-    if (request_.contentLength && !request_.tooLarge)
+    isRefused_ = request_.tooLarge || server.handler_.isRefused(request_);
+    if (request_.contentLength && !isRefused_)
       request_.body.reserve(std::min(*request_.contentLength, kFirstRoom));
   }
   ~Exchange() {
@@ -130,19 +131,24 @@ class HttpServer::Exchange {
 
   // The headers are there. A client that asks before it sends too much is answered at once.
   MHD_Result begin() {
-    if (const std::optional<Reply> refusal = server_.handler_.refusal(request_)) {
-      answered_ = true;
-      return send(connection_, *refusal, true);
-    }
-    if (request_.tooLarge && request_.header("Expect") != nullptr) return conclude();
-    return MHD_YES;
+    if (!isRefused_) return MHD_YES;
+    const bool isLong = request_.contentLength && *request_.contentLength > server_.maxDrainBytes_;
+    isLast_ = isLong || request_.header("Expect") != nullptr;
+    return isLast_ ? conclude() : MHD_YES;
   }
 
   MHD_Result take(const char* bytes, size_t* size) {
     request_.bodySize += *size;
     if (request_.bodySize > limit_) request_.tooLarge = true;
-    if (!request_.tooLarge && !request_.noRoom) keep({bytes, *size});
-    if (request_.tooLarge) request_.body.clear();
+    if (isRefused_ || request_.tooLarge)
+      sample({bytes, *size});
+    else if (!request_.noRoom)
+      keep({bytes, *size});
+    if (isRefused_ && request_.bodySize > server_.maxDrainBytes_) {
+      // In the middle of a body the library sends no answer.
+      static_cast<void>(conclude());
+      return MHD_NO;
+    }
     *size = 0;
     if (std::chrono::steady_clock::now() - request_.began <= server_.bodyTime_) return MHD_YES;
     request_.tooSlow = true;
@@ -176,6 +182,13 @@ class HttpServer::Exchange {
   }
 
  private:
+  // The beginning alone, of which some may be there.
+  void sample(std::string_view bytes) {
+    const uint64_t wanted = server_.handler_.sampleBytes();
+    if (request_.body.size() > wanted) request_.body.resize(wanted);
+    if (!request_.noRoom) keep(bytes.substr(0, wanted - request_.body.size()));
+  }
+
   // Takes room for the bytes from that of all requests.
   void keep(std::string_view bytes) {
     if ((server_.bodiesBytes_ += bytes.size()) > server_.maxBodiesBytes_) {
@@ -199,7 +212,7 @@ class HttpServer::Exchange {
   }
 
   MHD_Result finish(const Reply& reply) {
-    return send(connection_, reply, server_.refusesConnections_.load(std::memory_order_relaxed));
+    return send(connection_, reply, isLast_ || server_.refusesConnections_.load(std::memory_order_relaxed));
   }
 
   MHD_Result wait(Wait& wait) {
@@ -218,6 +231,8 @@ class HttpServer::Exchange {
   Request request_;
   Answer answer_;
   uint64_t limit_ = 0, kept_ = 0;
+  bool isRefused_ = false;  // whatever the body is
+  bool isLast_ = false;     // of its connection
   bool answered_ = false;
 };
 

@@ -32,6 +32,9 @@ struct ServerOptions {
   std::chrono::seconds requestTime{60};    // for a body to be whole
   std::chrono::seconds idleTime{60};       // a connection without a byte ends
   uint64_t maxBodiesBytes = ~uint64_t{0};  // of all requests that are not yet answered
+  // Of a body that is refused or too large so much is read before the answer. One that says it is longer is answered at once,
+  // and the connection ends; so it ends, without an answer, where more comes than was said.
+  uint64_t maxDrainBytes = ~uint64_t{0};
 };
 
 class HttpServer {
@@ -65,6 +68,7 @@ class HttpServer {
   HttpServer(const ServerOptions& options, bool secure, HttpHandler& handler, Suspensions& suspensions)
       : bodyTime_(options.requestTime),
         maxBodiesBytes_(options.maxBodiesBytes),
+        maxDrainBytes_(options.maxDrainBytes),
         secure_(secure),
         handler_(handler),
         suspensions_(suspensions) {}
@@ -76,6 +80,7 @@ class HttpServer {
 
   const std::chrono::seconds bodyTime_;
   const uint64_t maxBodiesBytes_;
+  const uint64_t maxDrainBytes_;
   const bool secure_;
   HttpHandler& handler_;
   Suspensions& suspensions_;

@@ -27,15 +27,30 @@ bool DeadLetters::mayBeSent() {
 
 void DeadLetters::send(const http::Request& request, const Rejection& rejection) {
   if (!mayBeSent()) return count(figures_.deadLettersLeftOut);
-  count(figures_.deadLetters);
   const TimeValue now = clock_.timeOfDay();
   auto letter = std::make_shared<LogMessage>();
+  const uint64_t bytes = std::max(request.bodySize, request.contentLength.value_or(0));
   letter->id = messageID(request.body);
   letter->headers =
       factsOf(request, letter->id, now.seconds * 1000 + now.microseconds / 1000, /*hasDigest=*/false);
-  letter->headers.emplace_back("Kyt-Reason", refusalName(rejection.refusal));
-  letter->headers.emplace_back("Kyt-Bytes", std::to_string(request.bodySize));
-  letter->body = request.body.substr(0, Limits::maxDeadLetterBytes);
+  // Of a part of it that is nobody's name.
+  if (request.body.size() != bytes) letter->headers.erase(letter->headers.begin());
+  publish(std::move(letter), rejection.refusal, request.body, bytes);
+}
+
+void DeadLetters::send(const LogMessage& message, Refusal refusal) {
+  if (!mayBeSent()) return count(figures_.deadLettersLeftOut);
+  auto letter = std::make_shared<LogMessage>();
+  letter->id = message.id;
+  letter->headers = message.headers;
+  publish(std::move(letter), refusal, message.body, message.body.size());
+}
+
+void DeadLetters::publish(std::shared_ptr<LogMessage> letter, Refusal refusal, std::string_view body,
+                          uint64_t bytes) {
+  letter->headers.emplace_back("Kyt-Reason", refusalName(refusal));
+  letter->headers.emplace_back("Kyt-Bytes", std::to_string(bytes));
+  letter->body = body.substr(0, Limits::maxDeadLetterBytes);
   log_.publishDeadLetter(std::move(letter));
 }
 

@@ -44,6 +44,9 @@ class Delivery final : public LogListener, public Replays {
   }  // partitions whose posts go to the spool
 
   void logAnswered(uint64_t token, const LogAnswer& answer) override EXCLUDES(mutex_);
+  void deadLetterAnswered(bool isStored) override {
+    count(isStored ? figures_.deadLetters : figures_.deadLettersLeftOut);
+  }
   void logIsUp(bool isUp) override EXCLUDES(mutex_);
   [[nodiscard]] bool takesReplays() const override { return isUp(); }
   void replay(int64_t number, std::shared_ptr<const LogMessage> message) override EXCLUDES(mutex_);

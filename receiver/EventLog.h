@@ -37,6 +37,8 @@ class LogListener {
  public:
   virtual ~LogListener() = default;
   virtual void logAnswered(uint64_t token, const LogAnswer& answer) = 0;
+  // Of a dead letter: whether the log has it. Once for each, but for those that the end of the process cuts off.
+  virtual void deadLetterAnswered(bool isStored) = 0;
   // Whether messages may be published. After `false` no answer to what was published before can be expected.
   virtual void logIsUp(bool isUp) = 0;
 };
@@ -48,7 +50,7 @@ class EventLog {
   virtual void start(LogListener& listener) = 0;
   // Any thread, never blocks. Answered once with the token, or never: when the answer is lost, or after logIsUp(false).
   virtual void publish(uint64_t token, std::shared_ptr<const LogMessage> message) = 0;
-  // Into the dead-letter stream. Nobody waits for an answer.
+  // Into the dead-letter stream.
   virtual void publishDeadLetter(std::shared_ptr<const LogMessage> message) = 0;
   // Bytes of body that a message may have; none: that is not known yet.
   [[nodiscard]] virtual std::optional<uint64_t> maxBodyBytes() const = 0;

@@ -11,6 +11,9 @@ namespace kyt::receiver {
 struct Limits {
   // Bytes of the bodies of all posts that are not yet answered: memory. Past it posts get 429.
   static constexpr uint64_t maxBodiesBytes = uint64_t{256} << 20;
+  // Of the body of a post that is refused by its headers, read and thrown away so that a front that is writing learns why:
+  // more than a front lets through.
+  static constexpr uint64_t maxDrainBytes = uint64_t{20} << 20;
   // Connections of the posts' port: descriptors. Further ones wait to be accepted.
   static constexpr unsigned maxConnections = 8192;
   static constexpr unsigned maxMetricsConnections = 16;

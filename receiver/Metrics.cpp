@@ -114,9 +114,11 @@ std::string metricsText(const MetricsSources& sources) {
   writePosts(out, figures);
   writeLog(out, figures, sources.delivery);
   writeSpool(out, figures, sources.spool);
-  out.counter("kyt_dead_letters", "Posts that can never be taken and were copied to the dead-letter stream.");
+  out.counter("kyt_dead_letters",
+              "Posts that can never be taken of which the dead-letter stream has a copy.");
   out.sample(figures.deadLetters);
-  out.counter("kyt_dead_letters_left_out", "Those that were too many a second for that.");
+  out.counter("kyt_dead_letters_left_out",
+              "Those that were too many a second for that, or whose copy the log did not take.");
   out.sample(figures.deadLettersLeftOut);
   http::HttpServer* const server = sources.server;
   out.gauge("kyt_connections", "Connections of the port of posts.");

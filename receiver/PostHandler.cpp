@@ -61,22 +61,20 @@ Reply PostHandler::reject(const Request& request, const Rejection& rejection) co
   return reply;
 }
 
-std::optional<Reply> PostHandler::refusal(const Request& request) const {
-  const std::optional<Rejection> rejection = check_.rejectionByHeaders(request);
-  if (!rejection) return std::nullopt;
-  return reject(request, *rejection);
+bool PostHandler::isRefused(const Request& request) const {
+  return check_.rejectionByHeaders(request).has_value();
 }
 
 uint64_t PostHandler::bodyLimit(const Request& /*request*/) const {
   return std::min(settings_.maxBodyBytes, log_.maxBodyBytes().value_or(settings_.maxBodyBytes));
 }
 
-Reply PostHandler::replyFor(Fate fate, uint64_t bytes, bool hasDigest) const {
+Reply PostHandler::replyFor(Fate fate, const LogMessage& message, bool hasDigest) const {
   switch (fate) {
     case Fate::stored:
     case Fate::spooled:
       count(fate == Fate::stored ? figures_.stored : figures_.spooled);
-      count(figures_.bodyBytes, bytes);
+      count(figures_.bodyBytes, message.body.size());
       count(hasDigest ? figures_.digestsValid : figures_.digestsAbsent);
       return {};
     case Fate::spoolFull:
@@ -85,6 +83,7 @@ Reply PostHandler::replyFor(Fate fate, uint64_t bytes, bool hasDigest) const {
       return refuse(Refusal::spoolBroken, "neither log nor spool can be written to");
     case Fate::tooLargeForLog:
       figures_.refuse(Refusal::tooLargeForLog);
+      deadLetters_.send(message, Refusal::tooLargeForLog);
       return textReply(413, "the log takes no body of that size\n");
   }
   return {};
@@ -96,9 +95,8 @@ void PostHandler::deliver(Request& request, bool hasDigest, const std::shared_pt
   message->id = messageID(request.body);
   message->headers = factsOf(request, message->id, now.seconds * 1000 + now.microseconds / 1000, hasDigest);
   message->body = std::move(request.body);
-  const uint64_t bytes = message->body.size();
-  delivery_.take(std::move(message), [this, later, bytes, hasDigest](Fate fate) {
-    later->give(replyFor(fate, bytes, hasDigest));
+  delivery_.take(message, [this, later, message, hasDigest](Fate fate) {
+    later->give(replyFor(fate, *message, hasDigest));
     --waiting_;
   });
 }
@@ -113,6 +111,7 @@ void PostHandler::open(Request& request, bool hasDigest, const std::shared_ptr<L
 
 Answer PostHandler::answer(Request& request) {
   bool hasDigest = false;
+  if (const auto rejection = check_.rejectionByHeaders(request)) return reject(request, *rejection);
   if (const auto rejection = check_.rejection(request, hasDigest)) return reject(request, *rejection);
   if (request.body.size() > Limits::surelyTakenBytes && !log_.maxBodyBytes())
     return refuse(Refusal::logLimitUnknown, "how large a body the log takes is not known yet");

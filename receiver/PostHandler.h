@@ -13,6 +13,7 @@
 #include "receiver/DeadLetters.h"
 #include "receiver/Delivery.h"
 #include "receiver/Figures.h"
+#include "receiver/Limits.h"
 #include "receiver/PostCheck.h"
 #include "receiver/Settings.h"
 
@@ -31,7 +32,8 @@ class PostHandler final : public http::HttpHandler {
   PostHandler(const Settings& settings, Options options, Delivery& delivery, EventLog& log,
               DeadLetters& deadLetters, const Clock& clock, Figures& figures);
 
-  [[nodiscard]] std::optional<http::Reply> refusal(const http::Request& request) const override;
+  [[nodiscard]] bool isRefused(const http::Request& request) const override;
+  [[nodiscard]] uint64_t sampleBytes() const override { return Limits::maxDeadLetterBytes; }
   [[nodiscard]] uint64_t bodyLimit(const http::Request& request) const override;
   [[nodiscard]] http::Answer answer(http::Request& request) override;
   void broken(http::Request& request) override;
@@ -45,7 +47,7 @@ class PostHandler final : public http::HttpHandler {
   [[nodiscard]] http::Reply refuse(Refusal refusal, const char* text) const;
   void open(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
   void deliver(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
-  [[nodiscard]] http::Reply replyFor(Fate fate, uint64_t bytes, bool hasDigest) const;
+  [[nodiscard]] http::Reply replyFor(Fate fate, const LogMessage& message, bool hasDigest) const;
 
   const Settings& settings_;
   const Options options_;

@@ -188,6 +188,7 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   // Last: posts come at once, and from then on nothing may fail that would leave one without an answer.
   http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings);
   portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
+  portOptions.maxDrainBytes = Limits::maxDrainBytes;
   server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
   if (!server) return lines.error("start: %s", error.c_str()), 1;
   sources.server = server.get();

@@ -145,13 +145,15 @@ void KafkaLog::publish(uint64_t token, std::shared_ptr<const LogMessage> message
 }
 
 void KafkaLog::publishDeadLetter(std::shared_ptr<const LogMessage> message) {
-  if (isThere_) static_cast<void>(produce(kDeadTopic, RD_KAFKA_PARTITION_UA, 0, *message));
+  if (!isThere_ || produce(kDeadTopic, RD_KAFKA_PARTITION_UA, 0, *message) != RD_KAFKA_RESP_ERR_NO_ERROR)
+    listener_->deadLetterAnswered(false);
 }
 
 void KafkaLog::onDelivery(rd_kafka_t* /*client*/, const rd_kafka_message_t* message, void* self) {
   auto& log = *static_cast<KafkaLog*>(self);
   const auto token = static_cast<uint64_t>(reinterpret_cast<uintptr_t>(message->_private));
-  if (token == 0 || log.isStopping_) return;
+  if (log.isStopping_) return;
+  if (token == 0) return log.listener_->deadLetterAnswered(message->err == RD_KAFKA_RESP_ERR_NO_ERROR);
   LogAnswer answer{LogVerdict::stored, {}};
   if (message->err == RD_KAFKA_RESP_ERR_MSG_SIZE_TOO_LARGE)
     answer = {LogVerdict::refusedForGood, rd_kafka_err2str(message->err)};

@@ -113,7 +113,8 @@ void NatsLog::publish(uint64_t token, std::shared_ptr<const LogMessage> message)
 }
 
 void NatsLog::publishDeadLetter(std::shared_ptr<const LogMessage> message) {
-  if (isConnected_) publish(0, std::move(message));
+  if (!isConnected_) return listener_->deadLetterAnswered(false);
+  publish(0, std::move(message));
 }
 
 void NatsLog::stop() {
@@ -238,6 +239,8 @@ void NatsLog::onDown(natsConnection* /*connection*/, void* self) {
   log.isConnected_ = false;
   log.hasStream_ = false;
   log.setUp(false);
+  for (uint64_t lost = log.deadInFlight_.exchange(0); lost > 0; --lost)
+    log.listener_->deadLetterAnswered(false);
 }
 
 void NatsLog::onClosed(natsConnection* /*connection*/, void* self) {
@@ -308,6 +311,9 @@ void NatsLog::onMessage(natsConnection* /*connection*/, natsSubscription* /*subs
   if (name.size() <= log.inbox_.size()) return;
   name.remove_prefix(log.inbox_.size());
   if (name == "names") return log.takeStreamNames(dataOf(message));
+  if (name == "dead")
+    return log.endDeadLetter(!natsMsg_IsNoResponders(message) &&
+                             dataOf(message).find("\"error\"") == std::string_view::npos);
   if (name == "info") return log.takeStreamInfo(dataOf(message));
   uint64_t token = 0;
   const auto [end, error] = std::from_chars(name.data(), name.data() + name.size(), token);
@@ -333,15 +339,23 @@ void NatsLog::takeAcknowledgement(uint64_t token, natsMsg* message) {
   listener_->logAnswered(token, {isDuplicate ? LogVerdict::duplicate : LogVerdict::stored, {}});
 }
 
+void NatsLog::endDeadLetter(bool isStored) {
+  uint64_t inFlight = deadInFlight_;
+  while (inFlight != 0 && !deadInFlight_.compare_exchange_weak(inFlight, inFlight - 1)) {
+  }
+  if (inFlight != 0)
+    listener_->deadLetterAnswered(isStored);  // else it was given up when the connection ended
+}
+
 natsStatus NatsLog::publish(const Item& item) {
   const LogMessage& content = *item.message;
   const bool isDead = item.token == 0;
   const std::string subject =
       isDead ? kDeadSubject : eventSubject(std::to_string(partitionOf(content.id, settings_.partitions)));
-  const std::string reply = isDead ? std::string() : inbox_ + std::to_string(item.token);
+  const std::string reply = inbox_ + (isDead ? "dead" : std::to_string(item.token));
   natsMsg* message = nullptr;
-  natsStatus status = natsMsg_Create(&message, subject.c_str(), isDead ? nullptr : reply.c_str(),
-                                     content.body.data(), static_cast<int>(content.body.size()));
+  natsStatus status = natsMsg_Create(&message, subject.c_str(), reply.c_str(), content.body.data(),
+                                     static_cast<int>(content.body.size()));
   const Owned<natsMsg> owned(message);
   if (status == NATS_OK && !isDead) status = natsMsgHeader_Set(message, "Nats-Msg-Id", content.id.c_str());
   for (const auto& [name, value] : content.headers)
@@ -350,9 +364,12 @@ natsStatus NatsLog::publish(const Item& item) {
 }
 
 void NatsLog::write(const Item& item) {
+  const bool isDead = item.token == 0;
+  if (isDead) ++deadInFlight_;
   // The library would keep it for when it is connected again; the spool does that better.
   const natsStatus status = isConnected_ ? publish(item) : NATS_CONNECTION_DISCONNECTED;
-  if (status == NATS_OK || item.token == 0) return;
+  if (status == NATS_OK) return;
+  if (isDead) return endDeadLetter(false);
   const auto verdict = status == NATS_MAX_PAYLOAD ? LogVerdict::refusedForGood : LogVerdict::refused;
   listener_->logAnswered(item.token, {verdict, textOf(status)});
 }

@@ -83,6 +83,7 @@ class NatsLog final : public EventLog {
   void askForRetention(std::string_view stream);
   void takeStreamInfo(std::string_view json);
   void takeAcknowledgement(uint64_t token, natsMsg* message);
+  void endDeadLetter(bool isStored);
   void setUp(bool isUp) EXCLUDES(upMutex_);
 
   const LogSettings& settings_;
@@ -92,6 +93,7 @@ class NatsLog final : public EventLog {
   Owned<natsConnection> connection_;
   Owned<natsSubscription> subscription_;
   std::atomic<uint64_t> maxBodyBytes_{kUnknown};
+  std::atomic<uint64_t> deadInFlight_{0};  // dead letters without an answer
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
   std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false};

@@ -42,8 +42,11 @@ class FakeLog final : public EventLog {
     listener_->logAnswered(token, answer);
   }
   void publishDeadLetter(std::shared_ptr<const LogMessage> message) override {
-    MutexLock lock(mutex_);
-    deadLetters_.push_back(std::move(message));
+    {
+      MutexLock lock(mutex_);
+      deadLetters_.push_back(std::move(message));
+    }
+    listener_->deadLetterAnswered(mood_ == Mood::stores);
   }
   [[nodiscard]] std::optional<uint64_t> maxBodyBytes() const override { return 1 << 20; }
   void stop() override {}

@@ -133,6 +133,19 @@ bool StreamView::setMaxBytes(int64_t bytes) {
   return isDone;
 }
 
+bool StreamView::setMaxMessageBytes(int32_t bytes) {
+  jsStreamInfo* info = nullptr;
+  if (js_GetStreamInfo(&info, context_, "kyt-events", nullptr, nullptr) != NATS_OK) return false;
+  info->Config->MaxMsgSize = bytes;
+  const bool isDone = js_UpdateStream(nullptr, context_, info->Config, nullptr, nullptr) == NATS_OK;
+  jsStreamInfo_Destroy(info);
+  return isDone;
+}
+
+bool StreamView::remove(const char* stream) {
+  return js_DeleteStream(context_, stream, nullptr, nullptr) == NATS_OK;
+}
+
 std::optional<StoredMessage> StreamView::message(uint64_t number, const char* stream) {
   natsMsg* message = nullptr;
   if (js_GetMsg(&message, context_, stream, number, nullptr, nullptr) != NATS_OK) return std::nullopt;

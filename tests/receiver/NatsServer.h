@@ -70,6 +70,8 @@ class StreamView {
   [[nodiscard]] bool purge(const char* stream = "kyt-events");
   // The stream may have so many bytes from now on.
   [[nodiscard]] bool setMaxBytes(int64_t bytes);
+  [[nodiscard]] bool setMaxMessageBytes(int32_t bytes);
+  [[nodiscard]] bool remove(const char* stream);
 
  private:
   natsConnection* connection_ = nullptr;

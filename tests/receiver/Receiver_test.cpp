@@ -109,10 +109,96 @@ TEST_F(ReceiverTest, RefusesWhatCanNeverBeTakenAndKeepsACopyOfIt) {
   EXPECT_EQ(letter->body, "no gzip");
   EXPECT_EQ(letter->headers.at("Kyt-Reason"), "not-gzip");
   EXPECT_EQ(letter->headers.at("Kyt-Bytes"), "7");
+  EXPECT_EQ(letter->headers.at("Kyt-Id").size(), 64U);
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_dead_letters_total") == 6; }));
   for (const char* reason :
        {"not-gzip", "empty", "wrong-encoding", "too-large", "unknown-path", "wrong-method"})
     EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"" + std::string(reason) + "\"}"), 1) << reason;
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"no-length\"}"), 2);
+}
+
+class DeadLettersOfTheReceiver : public ReceiverTest {
+ protected:
+  [[nodiscard]] StoredMessage letter(uint64_t number) {
+    std::optional<StoredMessage> found;
+    EXPECT_TRUE(eventually([&] { return (found = view_->message(number, "kyt-dead-letters")).has_value(); }));
+    return found.value_or(StoredMessage());
+  }
+};
+
+TEST_F(DeadLettersOfTheReceiver, HaveTheBeginningOfWhatIsRefusedBeforeItsBody) {
+  start();
+  const std::string large = "begin" + std::string(17 << 20, 'x'), wrong = postText(1, 100000);
+  ASSERT_EQ(receiver_->post(large).status, 413);
+  EXPECT_EQ(letter(1).body, large.substr(0, 65536));
+  EXPECT_EQ(letter(1).headers.at("Kyt-Bytes"), std::to_string(large.size()));
+  EXPECT_EQ(letter(1).headers.count("Kyt-Id"), 0U) << "that would be the name of a part";
+  ASSERT_EQ(receiver_->post(wrong, {"Content-Encoding: br"}).status, 415);
+  EXPECT_EQ(letter(2).body, wrong.substr(0, 65536));
+  EXPECT_EQ(letter(2).headers.at("Kyt-Reason"), "wrong-encoding");
+  HttpConnection chunked(receiver_->port());
+  chunked.send(
+      "POST /v1/events HTTP/1.1\r\nHost: t\r\nTransfer-Encoding: chunked\r\n\r\n5\r\nhello\r\n0\r\n\r\n");
+  ASSERT_EQ(chunked.receive().status, 411);
+  EXPECT_EQ(letter(3).body, "hello");
+  EXPECT_EQ(letter(3).headers.at("Kyt-Id").size(), 64U);
+  EXPECT_EQ(receiver_->metric("kyt_bodies_bytes"), 0);
+}
+
+TEST_F(DeadLettersOfTheReceiver, HaveWhatTheLogNeverTakes) {
+  start();
+  ASSERT_TRUE(view_->setMaxMessageBytes(50000));
+  const std::string body = postText(1, 100000);
+  ASSERT_EQ(receiver_->post(body).status, 413);
+  EXPECT_EQ(letter(1).body, body.substr(0, 65536));
+  EXPECT_EQ(letter(1).headers.at("Kyt-Reason"), "too-large-for-log");
+  EXPECT_EQ(letter(1).headers.at("Kyt-Bytes"), std::to_string(body.size()));
+}
+
+TEST_F(DeadLettersOfTheReceiver, CountAsSuchOnceTheLogHasThem) {
+  start();
+  ASSERT_EQ(receiver_->post("no gzip", {"Content-Encoding: gzip"}).status, 400);
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_dead_letters_total") == 1; }));
+  ASSERT_TRUE(view_->remove("kyt-dead-letters"));
+  ASSERT_EQ(receiver_->post("no gzip", {"Content-Encoding: gzip"}).status, 400);
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_dead_letters_left_out_total") == 1; }));
+  servers_.kill(0);
+  ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_log_up") == 0; }));
+  ASSERT_EQ(receiver_->post("no gzip", {"Content-Encoding: gzip"}).status, 400);
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_dead_letters_left_out_total") == 2; }));
+  EXPECT_EQ(receiver_->metric("kyt_dead_letters_total"), 1);
+}
+
+TEST_F(ReceiverTest, ReadsWhatItRefusesByItsHeadersSoThatTheFrontLearnsIt) {
+  start();
+  const std::string body(16 << 20, 'x');
+  for (const char* request : {"POST /v1/events HTTP/1.1\r\nContent-Encoding: br", "POST /elsewhere HTTP/1.1",
+                              "PUT /v1/events HTTP/1.1"}) {
+    HttpConnection front(receiver_->port());
+    ASSERT_TRUE(front.send(std::string(request) +
+                           "\r\nHost: t\r\nContent-Length: " + std::to_string(body.size()) + "\r\n\r\n"));
+    EXPECT_TRUE(front.send(body)) << request;
+    EXPECT_GE(front.receive().status, 404) << request;
+    EXPECT_EQ(front.post("/v1/events", postText(1)).status, 200) << "the connection stays";
+  }
+}
+
+TEST_F(ReceiverTest, WaitsForNoBodyThatSaysItIsTooLongToRead) {
+  start();
+  HttpConnection device(receiver_->port());
+  device.send("POST /v1/events HTTP/1.1\r\nHost: t\r\nContent-Length: 100000000000\r\n\r\n");
+  const HttpReply reply = device.receive();
+  EXPECT_EQ(reply.status, 413);
+  EXPECT_LT(reply.took, std::chrono::seconds(20));
+  EXPECT_TRUE(device.isClosed());
+  // Of one that does not say it, no more is read either.
+  HttpConnection endless(receiver_->port());
+  endless.send("POST /v1/events HTTP/1.1\r\nHost: t\r\nTransfer-Encoding: chunked\r\n\r\n");
+  const std::string chunk = "100000\r\n" + std::string(1 << 20, 'x') + "\r\n";
+  int sent = 0;
+  while (sent < 200 && endless.send(chunk)) ++sent;
+  EXPECT_LT(sent, 100);
+  EXPECT_TRUE(eventually([&] { return receiver_->metric("kyt_refused_total{reason=\"no-length\"}") == 1; }));
 }
 
 TEST_F(ReceiverTest, TakesAPostOfSeventeenMebibytes) {
