@@ -60,8 +60,13 @@ void Delivery::keep(std::shared_ptr<const LogMessage> message, Done done) {
   });
 }
 
+void Delivery::use(Partition& partition) {
+  if (!partition.isUsed.load(std::memory_order_relaxed) && !partition.isUsed.exchange(true)) ++used_;
+}
+
 void Delivery::trust(uint32_t partition) {
   Partition& taking = partitions_[partition];
+  use(taking);
   if (!taking.isTrusted.load(std::memory_order_relaxed)) taking.isTrusted = true;
   if (!taking.isFailing.load(std::memory_order_relaxed) || !taking.isFailing.exchange(false)) return;
   if (--failing_ != 0) return;
@@ -72,6 +77,7 @@ void Delivery::trust(uint32_t partition) {
 // Told of the first partition alone: a log that is in trouble has many.
 void Delivery::distrust(uint32_t partition, const char* why) {
   Partition& failed = partitions_[partition];
+  use(failed);
   {
     MutexLock lock(mutex_);
     if (failed.isTrusted.exchange(false)) failed.distrustedAt = clock_.monotonic();
@@ -86,6 +92,21 @@ void Delivery::tellFull(const std::string& why) {
   if (isFullTold_.exchange(true)) return;
   lines_.error("log: it has no room: %s; posts go to the spool until older ones leave it or it gets more",
                why.c_str());
+}
+
+// At once, and then now and then: whoever posts what is too large may not fill the journal.
+void Delivery::tellRefusedForGood(const std::string& why) {
+  uint64_t messages = 0;
+  {
+    const MonotonicTime now = clock_.monotonic();
+    MutexLock lock(mutex_);
+    ++refusedSince_;
+    if (refusalToldAt_ && now - *refusalToldAt_ < Limits::tellPause) return;
+    refusalToldAt_ = now;
+    messages = std::exchange(refusedSince_, 0);
+  }
+  lines_.error("log: messages that were refused for good: %llu, the last for %s",
+               static_cast<unsigned long long>(messages), why.c_str());
 }
 
 void Delivery::refused(Pending pending) {
@@ -108,7 +129,7 @@ void Delivery::answered(Pending pending, const LogAnswer& answer) {
       return pending.done(Fate::stored);
     case LogVerdict::refusedForGood:
       count(figures_.logRefusalsForGood);
-      lines_.error("log: a message is refused for good: %s", answer.text.c_str());
+      tellRefusedForGood(answer.text);
       trust(partition);
       if (isReplay) return spool_.replayed(pending.number, SpoolReplay::never);
       return pending.done(Fate::tooLargeForLog);

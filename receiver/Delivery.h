@@ -9,6 +9,7 @@
 #include <deque>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <unordered_map>
 #include <vector>
 
@@ -38,6 +39,11 @@ class Delivery final : public LogListener, public Replays {
 
   [[nodiscard]] bool wasUp() const { return wasUp_.load(); }  // the log was there once
   [[nodiscard]] bool isUp() const { return isUp_.load(); }
+  // It is there, and of the partitions that were given messages not all have failed and taken nothing since.
+  [[nodiscard]] bool takesMessages() const {
+    const uint64_t failing = failing_.load();
+    return isUp() && (failing == 0 || failing < used_.load());
+  }
   [[nodiscard]] uint64_t pending() EXCLUDES(mutex_);  // messages on their way to the log
   [[nodiscard]] uint64_t failing() const {
     return failing_.load();
@@ -61,6 +67,7 @@ class Delivery final : public LogListener, public Replays {
   struct Partition {
     std::atomic<bool> isTrusted{true};   // its last answer, or lack of one, was no failure
     std::atomic<bool> isFailing{false};  // it failed, and has taken nothing since
+    std::atomic<bool> isUsed{false};     // there was an answer of it, or the lack of one
     MonotonicTime distrustedAt{};        // of mutex_
   };
   [[nodiscard]] uint32_t partitionOf(const LogMessage& message) const;
@@ -68,9 +75,11 @@ class Delivery final : public LogListener, public Replays {
   void answered(Pending pending, const LogAnswer& answer);
   void refused(Pending pending);
   void keep(std::shared_ptr<const LogMessage> message, Done done);
+  void use(Partition& partition);
   void trust(uint32_t partition);
   void distrust(uint32_t partition, const char* why) EXCLUDES(mutex_);
   void tellFull(const std::string& why);
+  void tellRefusedForGood(const std::string& why) EXCLUDES(mutex_);
   [[nodiscard]] std::vector<Pending> takeLate(MonotonicTime now) EXCLUDES(mutex_);
 
   EventLog& log_;
@@ -81,10 +90,12 @@ class Delivery final : public LogListener, public Replays {
   const Duration publishTime_;
   std::atomic<bool> isUp_{false}, wasUp_{false};
   std::vector<Partition> partitions_;
-  std::atomic<uint64_t> failing_{0};
+  std::atomic<uint64_t> failing_{0}, used_{0};
   std::atomic<bool> isFullTold_{false};
   Mutex mutex_;
   uint64_t lastToken_ GUARDED_BY(mutex_) = 0;
+  uint64_t refusedSince_ GUARDED_BY(mutex_) = 0;  // for good, and not told of
+  std::optional<MonotonicTime> refusalToldAt_ GUARDED_BY(mutex_);
   std::unordered_map<uint64_t, Pending> pending_ GUARDED_BY(mutex_);
   std::deque<std::pair<MonotonicTime, uint64_t>> deadlines_ GUARDED_BY(mutex_);  // in their order
 };

@@ -41,6 +41,11 @@ struct Limits {
   static constexpr unsigned deadLettersPerSecond = 10;
   // After a failure, with no post in the spool to try the log with: until one of a device may.
   static constexpr std::chrono::milliseconds retryPause{1000};
+  // Between two lines about messages that the log refused for good, of which anybody may post any number.
+  static constexpr std::chrono::seconds tellPause{60};
+  // Seconds for the log to acknowledge: with spoolTime after it a post is answered before its front gives it up, which is
+  // after 10 where docs/FLEET.md is followed.
+  static constexpr double maxPublishSeconds = 4;
   // Bytes of a header that a message carries on; what is longer is cut.
   static constexpr size_t maxFactBytes = 256;
   // Where posts are opened: bytes after decompression, which are so many times those before, but so many at least and at

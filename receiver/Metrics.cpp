@@ -68,8 +68,9 @@ void writePosts(Text& out, const Figures& figures) {
 }
 
 void writeLog(Text& out, const Figures& figures, Delivery& delivery) {
-  out.gauge("kyt_log_up", "Whether the log's servers and stream are there.");
-  out.sample(delivery.isUp() ? 1 : 0);
+  out.gauge("kyt_log_up",
+            "Whether the log takes messages: it is there, and not all partitions with posts failed last.");
+  out.sample(delivery.takesMessages() ? 1 : 0);
   out.gauge("kyt_log_pending", "Messages that the log has not acknowledged yet.");
   out.sample(delivery.pending());
   out.gauge("kyt_log_failing",
@@ -132,6 +133,8 @@ const char* MetricsHandler::unreadiness() const {
   if (!isOpen_) return "the port of posts is not open";
   if (!sources_.delivery.wasUp()) return "the log has not been there yet";
   if (sources_.spool.bytes() >= sources_.spool.maxBytes() / 10 * 9) return "the spool is nearly full";
+  if (sources_.spool.isBroken() && !sources_.delivery.takesMessages())
+    return "neither log nor spool takes posts";
   return nullptr;
 }
 

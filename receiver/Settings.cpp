@@ -202,8 +202,8 @@ class Reading {
     double number = -1;
     if (const auto* whole = std::get_if<int64_t>(&node->value)) number = static_cast<double>(*whole);
     if (const auto* real = std::get_if<double>(&node->value)) number = *real;
-    if (!(number >= 0.05 && number <= 30)) {
-      section.wrong(node->line, key, "must be a number of seconds, from 0.05 to 30");
+    if (!(number >= 0.05 && number <= Limits::maxPublishSeconds)) {
+      section.wrong(node->line, key, "must be a number of seconds, from 0.05 to 4");
     } else {
       into = std::chrono::milliseconds(std::llround(number * 1000));
     }

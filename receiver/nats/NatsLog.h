@@ -96,7 +96,7 @@ class NatsLog final : public EventLog {
   std::atomic<uint64_t> deadInFlight_{0};  // dead letters without an answer
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
-  std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false};
+  std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false}, isTooSmall_{false};
   std::thread thread_;
 
   Mutex upMutex_;  // held while the listener is told, so that it is told in order

@@ -341,6 +341,35 @@ TEST_F(DeliveryTest, ARowThatTheDiskDoesNotGiveForNowIsTriedAgainAndStopsNoOther
   EXPECT_EQ(spool_.posts(), 0U);
 }
 
+TEST_F(DeliveryToPartitions, TheLogTakesMessagesWhileOneOfThoseThatAreUsedDoes) {
+  EXPECT_TRUE(delivery_.takesMessages());
+  setMoodOf(0, Mood::refuses);
+  static_cast<void>(take(idOf(0, 1)));
+  EXPECT_FALSE(delivery_.takesMessages()) << "no other has shown that it does";
+  static_cast<void>(take(idOf(1, 1)));
+  EXPECT_TRUE(delivery_.takesMessages());
+  setMoodOf(1, Mood::isSilent);
+  static_cast<void>(take(idOf(1, 2)));
+  pass(std::chrono::seconds(2));
+  EXPECT_FALSE(delivery_.takesMessages());
+  setMoodOf(1, Mood::stores);
+  for (int i = 0; i < 4; ++i) pass(std::chrono::seconds(1));
+  EXPECT_TRUE(delivery_.takesMessages());
+  delivery_.logIsUp(false);
+  EXPECT_FALSE(delivery_.takesMessages());
+}
+
+TEST_F(DeliveryTest, WhatTheLogNeverTakesIsToldOnceAMinute) {
+  log_.setMood(Mood::refusesForGood);
+  for (int i = 0; i < 100; ++i) EXPECT_EQ(*take(std::to_string(i)), Fate::tooLargeForLog);
+  EXPECT_EQ(sink_.count("refused for good: 1, the last for too large"), 1U);
+  EXPECT_EQ(sink_.count("refused for good"), 1U);
+  clock_.advance(Limits::tellPause);
+  static_cast<void>(take("a"));
+  EXPECT_EQ(sink_.count("refused for good: 100, the last for too large"), 1U);
+  EXPECT_EQ(figures_.logRefusalsForGood, 101U);
+}
+
 TEST_F(DeliveryTest, APostThatTheLogNeverTakesDoesNotMakeTheSpoolOld) {
   log_.setMood(Mood::refuses);
   for (const char* id : {"a", "b"}) static_cast<void>(take(id));

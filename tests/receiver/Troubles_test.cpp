@@ -201,6 +201,25 @@ TEST_F(ReceiverOnASmallLog, KeepsNothingThatTheLogMayNeverTakeBeforeTheLogWasThe
   EXPECT_EQ(receiver_->post(std::string(kTooLarge, 'x')).status, 413);
 }
 
+class ReceiverOnALogForTinyMessages : public ReceiverTest {
+ protected:
+  ReceiverOnALogForTinyMessages() : ReceiverTest({1, "max_payload: 8KB"}) {}
+};
+
+TEST_F(ReceiverOnALogForTinyMessages, IsNotReadyAndRefusesNothingForGood) {
+  ReceiverProcess::Options options;
+  options.servers = servers_.urlsAsToml();
+  receiver_.emplace(options);
+  ASSERT_TRUE(eventually([&] {
+    return receiver_->output().find("max_payload is below 73728") != std::string::npos;
+  })) << receiver_->output();
+  EXPECT_EQ(receiver_->post(std::string(2 << 20, 'x')).status, 429);
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
+  EXPECT_EQ(receiver_->metric("kyt_log_up"), 0);
+  EXPECT_EQ(receiver_->get("/readyz").status, 503);
+}
+
 TEST_F(ReceiverInTrouble, AConnectionThatEndsInTheMiddleOfAPostIsCounted) {
   start();
   {
@@ -294,9 +313,11 @@ TEST_F(ReceiverInTrouble, WithTheStreamFullItSpoolsAndWithTheSpoolFullItRefusesW
   EXPECT_EQ(statuses[200] + statuses[429], statuses[200] + 5) << "no other answer";
   EXPECT_GT(statuses[200], 25);
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"spool-full\"}"), 5);
+  EXPECT_EQ(receiver_->metric("kyt_log_up"), 0) << "it takes nothing";
   EXPECT_EQ(receiver_->get("/readyz").status, 503);
   ASSERT_TRUE(view_->setMaxBytes(-1));
   EXPECT_TRUE(spoolBecomesEmpty());
+  EXPECT_EQ(receiver_->metric("kyt_log_up"), 1);
   EXPECT_EQ(receiver_->get("/readyz").status, 200);
   EXPECT_EQ(receiver_->post(postText(1000)).status, 200);
   EXPECT_EQ(view_->messages(), taken.size() + 1);
@@ -321,6 +342,7 @@ TEST_F(ReceiverInTrouble, WithTheSpoolsDiskFullItRefusesWith429AndGoesOnWhenTheL
   EXPECT_EQ(refused, 5);
   EXPECT_GT(taken, 15);
   EXPECT_GE(receiver_->metric("kyt_refused_total{reason=\"spool-broken\"}"), 5);
+  EXPECT_EQ(receiver_->get("/readyz").status, 503) << "another receiver may have a better disk";
   ASSERT_TRUE(view_->setMaxBytes(-1));
   EXPECT_TRUE(eventually([&] { return receiver_->post(postText(1000)).status == 200; }));
   EXPECT_TRUE(spoolBecomesEmpty()) << receiver_->output();
