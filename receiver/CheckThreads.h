@@ -1,12 +1,18 @@
-// Threads that open posts, so that a large one keeps none of the server's threads from others' posts. Any thread may submit;
-// what is submitted is bounded by the bodies that the server keeps.
+// Threads that open posts, so that a large one keeps none of the server's threads from others' posts. Each post is looked at as
+// if it were small; one that turns out to be larger begins anew behind others of its size, with threads of their own. So posts
+// that inflate to very much hold up each other alone. Of these a bounded number waits, and none for long: the others are
+// refused for now. Any thread may submit.
 #pragma once
 
+#include <array>
+#include <cstddef>
+#include <cstdint>
 #include <deque>
 #include <functional>
 #include <thread>
 #include <vector>
 
+#include "platform/base/Clock.h"
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
 
@@ -14,21 +20,40 @@ namespace kyt::receiver {
 
 class CheckThreads {
  public:
-  explicit CheckThreads(unsigned count);
-  ~CheckThreads();  // does what was submitted
+  struct Work {
+    size_t bytes = 0;  // of the body as sent
+    // False: once it is opened it has more bytes than that, and nothing was done.
+    std::function<bool(uint64_t mostBytes)> look;
+    std::function<void()> refuse;
+  };
+  explicit CheckThreads(const Clock& clock);
+  ~CheckThreads();  // does or refuses what was submitted
   CheckThreads(const CheckThreads&) = delete;
   CheckThreads& operator=(const CheckThreads&) = delete;
 
-  void submit(std::function<void()> work) EXCLUDES(mutex_);
+  // One of the two is called once more or once, the second at once or later.
+  void submit(Work work) EXCLUDES(mutex_);
 
  private:
-  void run() EXCLUDES(mutex_);
+  struct Waiting {
+    Work work;
+    MonotonicTime since{};
+  };
+  struct Level {
+    std::deque<Waiting> waiting;
+    size_t bytes = 0;  // of the bodies of these
+    bool isStopping = false;
+    ConditionVariable changed;
+  };
+  static constexpr size_t kLevels = 3;
+  void put(size_t level, Waiting waiting) EXCLUDES(mutex_);
+  void run(size_t level) EXCLUDES(mutex_);
+  void look(size_t level, Waiting waiting) EXCLUDES(mutex_);
 
+  const Clock& clock_;
   Mutex mutex_;
-  ConditionVariable changed_;
-  std::deque<std::function<void()>> work_ GUARDED_BY(mutex_);
-  bool isStopping_ GUARDED_BY(mutex_) = false;
-  std::vector<std::thread> threads_;
+  std::array<Level, kLevels> levels_ GUARDED_BY(mutex_);
+  std::array<std::vector<std::thread>, kLevels> threads_;
 };
 
 }  // namespace kyt::receiver

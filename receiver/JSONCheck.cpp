@@ -20,7 +20,8 @@ class Text {
  public:
   using Ch = char;
 
-  Text(std::string_view body, bool isGzip) : left_(body), isGzip_(isGzip) {
+  Text(std::string_view body, bool isGzip, uint64_t mostBytes)
+      : left_(body), isGzip_(isGzip), mostBytes_(mostBytes) {
     if (isGzip_) {
       limit_ = mostInflatedBytes(body.size());
       stream_.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(body.data()));
@@ -51,6 +52,7 @@ class Text {
   // All of the body was read, and nothing of it was wrong.
   [[nodiscard]] bool isAtEnd() const { return at_ == block_.size() && !problem_; }
   [[nodiscard]] const char* problem() const { return problem_; }
+  [[nodiscard]] bool hasMore() const { return hasMore_; }
   [[nodiscard]] bool isStringTooLong() const { return stringBytes_ > Limits::maxJSONStringBytes; }
 
  private:
@@ -73,6 +75,12 @@ class Text {
     at_ = 0;
     if (isGzip_) return inflateMore();
     block_ = std::exchange(left_, {});
+    if (block_.size() > mostBytes_) setMore();
+  }
+  void setMore() {
+    hasMore_ = true;
+    problem_ = "it has more";
+    block_ = {};
   }
   void inflateMore() {
     block_ = {};
@@ -90,6 +98,8 @@ class Text {
         problem_ = "the body is no gzip";
       } else if (before_ + made > limit_) {
         problem_ = "the gzip body inflates to too much";
+      } else if (before_ + made > mostBytes_) {
+        setMore();
       } else {
         block_ = {room_.data(), made};
       }
@@ -98,6 +108,8 @@ class Text {
 
   std::string_view left_, block_;
   const bool isGzip_;
+  const uint64_t mostBytes_;
+  bool hasMore_ = false;  // than these
   size_t at_ = 0, before_ = 0;
   uint64_t limit_ = 0;
   size_t stringBytes_ = 0;  // of the string that is being read, as it is written
@@ -163,17 +175,25 @@ uint64_t mostInflatedBytes(size_t compressed) {
 }
 
 std::optional<PostProblem> problemOfPost(std::string_view body, bool isGzip) {
-  Text text(body, isGzip);
+  return lookAtPost(body, isGzip, ~uint64_t{0}).problem;
+}
+
+PostLook lookAtPost(std::string_view body, bool isGzip, uint64_t mostBytes) {
+  Text text(body, isGzip, mostBytes);
   Shape shape;
   rapidjson::Reader reader;
   const rapidjson::ParseResult result = reader.Parse<kParseFlags>(text, shape);
-  if (text.problem() != nullptr) return PostProblem{!text.isStringTooLong(), text.problem()};
-  if (shape.problem() != nullptr) return PostProblem{false, shape.problem()};
+  if (text.hasMore()) return {true, {}};
+  const auto wrong = [](bool isOfGzip, std::string what) {
+    return PostLook{false, PostProblem{isOfGzip, std::move(what)}};
+  };
+  if (text.problem() != nullptr) return wrong(!text.isStringTooLong(), text.problem());
+  if (shape.problem() != nullptr) return wrong(false, shape.problem());
   if (result.IsError())
-    return PostProblem{false, "the JSON is malformed at byte " + std::to_string(result.Offset()) + ": " +
-                                  rapidjson::GetParseError_En(result.Code())};
-  if (!text.isAtEnd()) return PostProblem{false, "the JSON ends before the body"};
-  return std::nullopt;
+    return wrong(false, "the JSON is malformed at byte " + std::to_string(result.Offset()) + ": " +
+                            rapidjson::GetParseError_En(result.Code()));
+  if (!text.isAtEnd()) return wrong(false, "the JSON ends before the body");
+  return {};
 }
 
 }  // namespace kyt::receiver

@@ -17,6 +17,13 @@ struct PostProblem {
 
 [[nodiscard]] std::optional<PostProblem> problemOfPost(std::string_view body, bool isGzip);
 
+struct PostLook {
+  bool hasMore = false;  // than the bytes that were to be looked at: nothing is known of it
+  std::optional<PostProblem> problem;
+};
+// The same, but of a post that has no more than so many bytes once it is opened.
+[[nodiscard]] PostLook lookAtPost(std::string_view body, bool isGzip, uint64_t mostBytes);
+
 // Bytes that a compressed body of so many may have.
 [[nodiscard]] uint64_t mostInflatedBytes(size_t compressed);
 

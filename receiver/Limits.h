@@ -2,6 +2,7 @@
 // left out, and counted (Figures.h).
 #pragma once
 
+#include <array>
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
@@ -57,7 +58,15 @@ struct Limits {
   // Bytes of a string of the JSON, as it is written there: it is collected in memory before it is looked at. A client's
   // message to the daemon has 1 MiB, of which each byte may be written as six.
   static constexpr size_t maxJSONStringBytes = size_t{8} << 20;
+  // Threads for posts that are small once they are opened, as devices' are. One more for each larger size.
   static constexpr unsigned checkThreads = 2;
+  // What is larger than one of these, in bytes once it is opened, waits for others of its size alone. The first holds a
+  // batch of some hundred events.
+  static constexpr std::array<uint64_t, 3> checkSizes = {uint64_t{1} << 20, uint64_t{16} << 20, ~uint64_t{0}};
+  // Bytes of the bodies of each larger size that wait to be opened: memory, of which small posts need some too.
+  static constexpr size_t maxWaitingCheckBytes = size_t{32} << 20;
+  // A post waits so long to be opened; a front waits 10 s, and log and spool may need 7 of them.
+  static constexpr std::chrono::seconds checkTime{2};
   // Seconds that a log may be told to keep posts: ten years. More is a mistake, and the servers count nanoseconds.
   static constexpr int64_t maxAgeSeconds = int64_t{10} * 365 * 86400;
   // Servers, paths and keys that a configuration may name: more is a mistake.

@@ -42,7 +42,7 @@ PostHandler::PostHandler(const Settings& settings, Options options, Delivery& de
       clock_(clock),
       figures_(figures),
       check_(settings) {
-  if (options.opensPosts) checks_.emplace(Limits::checkThreads);
+  if (options.opensPosts) checks_.emplace(clock);
 }
 
 Reply PostHandler::refuse(Refusal refusal, const char* text) const {
@@ -101,12 +101,32 @@ void PostHandler::deliver(Request& request, bool hasDigest, const std::shared_pt
   });
 }
 
-void PostHandler::open(Request& request, bool hasDigest, const std::shared_ptr<LaterReply>& later) {
-  const auto problem = problemOfPost(request.body, isGzip(request));
-  if (!problem) return deliver(request, hasDigest, later);
-  const Refusal refusal = problem->isGzip ? Refusal::notGzip : Refusal::notJSON;
-  later->give(reject(request, {refusal, 400, problem->text}));
+// False: it has more than so many bytes, once it is opened.
+bool PostHandler::open(Request& request, bool hasDigest, const std::shared_ptr<LaterReply>& later,
+                       uint64_t mostBytes) {
+  const PostLook look = lookAtPost(request.body, isGzip(request), mostBytes);
+  if (look.hasMore) return false;
+  if (!look.problem) {
+    deliver(request, hasDigest, later);
+    return true;
+  }
+  const Refusal refusal = look.problem->isGzip ? Refusal::notGzip : Refusal::notJSON;
+  later->give(reject(request, {refusal, 400, look.problem->text}));
   --waiting_;
+  return true;
+}
+
+void PostHandler::submit(Request& request, bool hasDigest, const std::shared_ptr<LaterReply>& later) {
+  CheckThreads::Work work;
+  work.bytes = request.body.size();
+  work.look = [this, &request, hasDigest, later](uint64_t mostBytes) {
+    return open(request, hasDigest, later, mostBytes);
+  };
+  work.refuse = [this, later] {
+    later->give(refuse(Refusal::bodiesFull, "too many large posts wait to be opened"));
+    --waiting_;
+  };
+  checks_->submit(std::move(work));
 }
 
 Answer PostHandler::answer(Request& request) {
@@ -123,7 +143,7 @@ Answer PostHandler::answer(Request& request) {
   }
   // The request stays until the reply is given.
   if (checks_)
-    checks_->submit([this, &request, hasDigest, later] { open(request, hasDigest, later); });
+    submit(request, hasDigest, later);
   else
     deliver(request, hasDigest, later);
   return later;

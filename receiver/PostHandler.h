@@ -45,7 +45,9 @@ class PostHandler final : public http::HttpHandler {
  private:
   [[nodiscard]] http::Reply reject(const http::Request& request, const Rejection& rejection) const;
   [[nodiscard]] http::Reply refuse(Refusal refusal, const char* text) const;
-  void open(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
+  [[nodiscard]] bool open(http::Request& request, bool hasDigest,
+                          const std::shared_ptr<http::LaterReply>& later, uint64_t mostBytes);
+  void submit(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
   void deliver(http::Request& request, bool hasDigest, const std::shared_ptr<http::LaterReply>& later);
   [[nodiscard]] http::Reply replyFor(Fate fate, const LogMessage& message, bool hasDigest) const;
 

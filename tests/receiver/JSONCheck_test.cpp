@@ -30,6 +30,21 @@ TEST(PostsJSON, IsTakenAsTheDaemonSendsIt) {
       << "over several blocks";
 }
 
+TEST(PostsJSON, OfMoreBytesThanAreToBeLookedAtIsNotJudged) {
+  for (const bool isGzip : {false, true}) {
+    const auto lookAt = [&](const std::string& text, uint64_t most) {
+      return lookAtPost(isGzip ? gzipped(text) : text, isGzip, most);
+    };
+    const std::string good = postText(1, 100000), bad = "[" + good;
+    EXPECT_TRUE(lookAt(good, good.size() - 1).hasMore);
+    EXPECT_FALSE(lookAt(good, good.size() - 1).problem);
+    EXPECT_FALSE(lookAt(good, good.size()).hasMore);
+    EXPECT_FALSE(lookAt(good, good.size()).problem);
+    EXPECT_TRUE(lookAt(bad, bad.size()).problem);
+    EXPECT_FALSE(lookAt(bad, bad.size()).hasMore);
+  }
+}
+
 TEST(PostsJSON, IsRefusedInAnyOtherShape) {
   EXPECT_EQ(problemOf("[]"), "the message is no object");
   EXPECT_EQ(problemOf("1"), "the message is no object");

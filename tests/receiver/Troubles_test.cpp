@@ -66,6 +66,33 @@ TEST_F(ReceiverInTrouble, OpensPostsWhereItIsToldToAndRefusesBombsAndWrongJSON) 
   EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"not-gzip\"}"), 2);
 }
 
+TEST_F(ReceiverInTrouble, BombsInFlightSlowNobodyElse) {
+  ReceiverProcess::Options options;
+  options.arguments = {"--check", "full"};
+  start(options);
+  // The most that a body of its size may hold: many short values, of which each is looked at.
+  std::string values;
+  while (values.size() < (100 << 20)) values += "{\"a\":1,\"b\":2,\"c\":3},";
+  values.back() = ']';
+  const std::string bomb = gzipped("{\"events\":[" + values + "}");
+  ASSERT_LT(bomb.size(), 2U << 20);
+  values.clear();
+  std::atomic<int> posted{0}, others{0};
+  std::vector<std::thread> bombers;
+  for (int i = 0; i < 32; ++i)
+    bombers.emplace_back([&] {
+      HttpConnection connection(receiver_->port());
+      ++posted;
+      const int status = connection.post("/v1/events", bomb, {"Content-Encoding: gzip"}).status;
+      if (status != 200 && status != 400 && status != 429) ++others;
+    });
+  ASSERT_TRUE(eventually(
+      [&] { return posted == 32 && receiver_->metric("kyt_bodies_bytes").value_or(0) > bomb.size(); }));
+  expectOthersAreServed();
+  for (std::thread& bomber : bombers) bomber.join();
+  EXPECT_EQ(others, 0);
+}
+
 TEST_F(ReceiverInTrouble, AMetricsPortThatIsTakenEndsTheStartInOrderThoughPostsCome) {
   start();
   ReceiverProcess::Options options;
