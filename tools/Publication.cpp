@@ -18,6 +18,8 @@ namespace kyt::tools {
 
 namespace {
 
+constexpr int kMostOfOneTime = 1000;  // documents of one name and time that are kept
+
 Error failure(const std::string& path) {
   return Error{"KYTToolsErrorDomain", errno, path + ": " + std::strerror(errno)};
 }
@@ -57,10 +59,23 @@ std::optional<Error> writeBeside(std::string& path, std::string_view document, i
   return error;
 }
 
-// A second name for the document that is about to be replaced.
-std::optional<Error> keep(const std::string& file, const std::string& folder, const std::string& kept) {
+bool isSameFile(const std::string& one, const std::string& another) {
+  struct stat first {
+  }, second{};
+  return stat(one.c_str(), &first) == 0 && stat(another.c_str(), &second) == 0 &&
+         first.st_dev == second.st_dev && first.st_ino == second.st_ino;
+}
+
+// A second name for the document that is about to be replaced: `kept`, or where another document has that name, since it had
+// the same time, the first of "KEPT.2", "KEPT.3" and so on that is free.
+std::optional<Error> keep(const std::string& file, const std::string& folder, std::string& kept) {
   if (mkdir(folder.c_str(), 0755) != 0 && errno != EEXIST) return failure(folder);
-  if (link(file.c_str(), kept.c_str()) != 0 && errno != EEXIST) return failure(kept);
+  const std::string first = kept;
+  for (int number = 2; link(file.c_str(), kept.c_str()) != 0; ++number) {
+    if (errno != EEXIST || number > kMostOfOneTime) return failure(kept);
+    if (isSameFile(file, kept)) break;  // an attempt that got no further
+    kept = first + "." + std::to_string(number);
+  }
   const Descriptor opened = owned(open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!opened || fsync(opened.get()) != 0) return failure(folder);
   return std::nullopt;

@@ -12,7 +12,8 @@
 
 namespace kyt::tools {
 
-// Where the documents that were replaced stay, below the folder: NAME.TIME, the time as their "Last-Modified" said it.
+// Where the documents that were replaced stay, below the folder: NAME.TIME, the time as their "Last-Modified" said it; of
+// several of one time the second is NAME.TIME.2.
 inline constexpr char kPublishedBefore[] = ".published";
 
 struct Publication {

@@ -1,5 +1,6 @@
 #include "tools/Publication.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -7,6 +8,7 @@
 #include <filesystem>
 #include <string>
 #include <thread>
+#include <utility>
 
 #include "tests/support/TemporaryFolder.h"
 
@@ -51,6 +53,30 @@ TEST_F(PublicationTest, KeepsThoseBefore) {
   EXPECT_EQ(folder_.read(".published/dulvek.20231114T221320Z"), "one");
   EXPECT_EQ(folder_.read(".published/dulvek.20231114T221330Z"), "two");
   EXPECT_EQ(folder_.read("dulvek"), "three");
+}
+
+TEST_F(PublicationTest, KeepsEachOfSeveralThatHadTheSameTime) {
+  static_cast<void>(put("one", kNow));
+  static_cast<void>(put("two", kNow + 10));
+  // Somebody puts others in its place that have the time of the first, as "cp -p" does.
+  for (const auto& [document, kept] :
+       {std::pair("three", "dulvek.20231114T221320Z.2"), std::pair("four", "dulvek.20231114T221320Z.3")}) {
+    std::filesystem::remove(folder_ / "dulvek");
+    const std::string file = folder_.write("dulvek", document);
+    const timespec times[2] = {{kNow, 0}, {kNow, 0}};
+    ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
+    EXPECT_EQ(put("next", kNow + 30).kept, folder_ / ".published/" + kept);
+    EXPECT_EQ(folder_.read(std::string(".published/") + kept), document);
+  }
+  EXPECT_EQ(folder_.read(".published/dulvek.20231114T221320Z"), "one");
+}
+
+TEST_F(PublicationTest, GoesOnWhereAnAttemptHadKeptTheDocumentAndGotNoFurther) {
+  static_cast<void>(put("one", kNow));
+  const std::string kept = folder_ / ".published/dulvek.20231114T221320Z";
+  std::filesystem::create_directory(folder_ / ".published");
+  std::filesystem::create_hard_link(folder_ / "dulvek", kept);
+  EXPECT_EQ(put("two", kNow + 10).kept, kept);
 }
 
 TEST_F(PublicationTest, LetsEverybodyReadAndLeavesNothingElseBehind) {
