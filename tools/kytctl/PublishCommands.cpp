@@ -1,7 +1,9 @@
 // Storebags on their way to a server: publishing one, and telling beforehand what it changes.
 #include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <filesystem>
+#include <thread>
 
 #include "config/StorebagGuard.h"
 #include "platform/base/TextEscape.h"
@@ -42,6 +44,15 @@ std::optional<std::string> giveSerial(Dictionary& bag, std::optional<int64_t> be
   return std::nullopt;
 }
 
+// Until the second is over that servers tell of the document: what is published next, into another folder too, has another
+// time then and another serial, or a device that moves between the two would be told that nothing has changed. Not where
+// that second lies far ahead.
+void waitUntilAfter(int64_t second) {
+  const TimeValue now = LinuxClock().timeOfDay();
+  if (second != now.seconds) return;
+  std::this_thread::sleep_for(std::chrono::microseconds(1'000'000 - now.microseconds));
+}
+
 }  // namespace
 
 int publishCommand(const PublishOptions& options) {
@@ -69,6 +80,8 @@ int publishCommand(const PublishOptions& options) {
         stderr,
         "warning: its time is %lld s ahead, since the one before was that new: some servers hide that\n",
         static_cast<long long>(made.modified - now));
+  std::fflush(stdout);
+  waitUntilAfter(made.modified);
   return 0;
 }
 
