@@ -3,13 +3,12 @@
 // empty one are headers; the rest is the body. What is checked besides memory: each refusal has a status that silences no
 // device, what a message carries on is plain text within its limit, and a body that is opened as it is inflated is judged as
 // one that was inflated before.
-#include <zlib.h>
-
 #include <cstdint>
 #include <cstdlib>
 #include <string>
 #include <string_view>
 
+#include "fuzz/Gzipped.h"
 #include "http/Gzip.h"
 #include "platform/base/TextEscape.h"
 #include "receiver/JSONCheck.h"
@@ -21,20 +20,6 @@ namespace {
 
 void require(bool condition) {
   if (!condition) std::abort();
-}
-
-std::string gzipped(std::string_view text) {
-  z_stream stream{};
-  require(deflateInit2(&stream, Z_BEST_SPEED, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY) == Z_OK);
-  std::string out(deflateBound(&stream, text.size()) + 32, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(out.data());
-  stream.avail_out = static_cast<uInt>(out.size());
-  require(deflate(&stream, Z_FINISH) == Z_STREAM_END);
-  out.resize(stream.total_out);
-  deflateEnd(&stream);
-  return out;
 }
 
 Settings settingsOf(DigestPolicy policy) {
@@ -59,7 +44,7 @@ http::Request requestOf(uint8_t flags, std::string_view text) {
     if (colon != std::string_view::npos)
       request.headers.push_back({std::string(line.substr(0, colon)), std::string(line.substr(colon + 2))});
   }
-  request.body = (flags & 4) != 0 ? gzipped(text) : std::string(text);
+  request.body = (flags & 4) != 0 ? fuzz::gzipped(text) : std::string(text);
   if ((flags & 8) == 0) request.contentLength = request.body.size();
   return request;
 }

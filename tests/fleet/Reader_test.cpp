@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 #include <nats/nats.h>
 #include <unistd.h>
-#include <zlib.h>
 
 #include <chrono>
 #include <filesystem>
@@ -24,19 +23,7 @@
 namespace kyt {
 namespace {
 
-std::string gzipped(const std::string& text) {
-  z_stream stream{};
-  deflateInit2(&stream, Z_BEST_SPEED, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY);
-  std::string out(deflateBound(&stream, text.size()) + 32, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(out.data());
-  stream.avail_out = static_cast<uInt>(out.size());
-  deflate(&stream, Z_FINISH);
-  out.resize(stream.total_out);
-  deflateEnd(&stream);
-  return out;
-}
+using receiver::gzipped;
 
 // So many events, of a device.
 std::string message(int number, int events = 2) {
@@ -84,26 +71,17 @@ class Reader : public ::testing::Test {
     ASSERT_EQ(natsConnection_JetStream(&context_, connection_, nullptr), NATS_OK);
     makeStream();
   }
-  void makeStream() {
+  // The stream knows repeats for that long; 0: the server's default.
+  void makeStream(std::chrono::nanoseconds knowsRepeats = {}) {
     jsStreamConfig stream;
     jsStreamConfig_Init(&stream);
     const char* subjects[] = {"kyt.events.*"};
     stream.Name = "kyt-events";
     stream.Subjects = subjects;
     stream.SubjectsLen = 1;
-    ASSERT_TRUE(
-        eventually([&] { return js_AddStream(nullptr, context_, &stream, nullptr, nullptr) == NATS_OK; }));
-  }
-  // The stream knows repeats no longer than that.
-  void forgetAfter(std::chrono::nanoseconds time) {
-    jsStreamConfig stream;
-    jsStreamConfig_Init(&stream);
-    const char* subjects[] = {"kyt.events.*"};
-    stream.Name = "kyt-events";
-    stream.Subjects = subjects;
-    stream.SubjectsLen = 1;
-    stream.Duplicates = time.count();
-    ASSERT_EQ(js_UpdateStream(nullptr, context_, &stream, nullptr, nullptr), NATS_OK);
+    stream.Duplicates = knowsRepeats.count();
+    const auto make = knowsRepeats.count() > 0 ? js_UpdateStream : js_AddStream;
+    ASSERT_TRUE(eventually([&] { return make(nullptr, context_, &stream, nullptr, nullptr) == NATS_OK; }));
   }
   void TearDown() override {
     if (reader_.pid() > 0) {
@@ -221,7 +199,7 @@ TEST_F(Reader, LeavesRepeatsOutByTheirID) {
 
 // As where a post's acknowledgement was lost and the spool gives it to the log much later, or a device's outbox repeats it.
 TEST_F(Reader, HasAPostOnceThatTheLogHasTwiceSinceItHadForgottenTheFirst) {
-  forgetAfter(std::chrono::milliseconds(100));
+  makeStream(std::chrono::milliseconds(100));  // of the one that is there
   receiver::ReceiverProcess::Options options;
   options.servers = "[\"" + url() + "\"]";
   receiver::ReceiverProcess receiver(options);
