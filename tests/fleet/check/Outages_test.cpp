@@ -80,6 +80,12 @@ class Load {
     for (const Result& result : results_) all += result.serverErrors;
     return all;
   }
+  // Of the refused, those without an answer.
+  [[nodiscard]] int broken() const {
+    int all = 0;
+    for (const Result& result : results_) all += result.broken;
+    return all;
+  }
   [[nodiscard]] double longest() const {
     double longest = 0;
     for (const Result& result : results_)
@@ -98,7 +104,7 @@ class Load {
   struct Result {
     std::vector<std::string> answered;  // with 200: their IDs
     std::vector<double> times;          // of all that were answered, seconds
-    int refused = 0, serverErrors = 0;
+    int refused = 0, serverErrors = 0, broken = 0;
   };
 
   void run(int thread) {
@@ -130,6 +136,7 @@ class Load {
       else
         ++result.refused, ++refusedSoFar_;
       if (status >= 500) ++result.serverErrors;
+      if (status == 0) ++result.broken;
       std::this_thread::sleep_for(pause_);  // how often a device posts, not a wait for anything
     }
     curl_slist_free_all(headers);
@@ -271,6 +278,8 @@ TEST_F(FleetCheck, WithoutReceiversDevicesAreToldToComeAgain) {
     EXPECT_FALSE(problem) << problem->localizedDescription;
   }
   expectWhole("no receiver");
+  EXPECT_GT(load_->refused(), 0);
+  EXPECT_EQ(load_->broken(), 0) << "the front itself answers";
 }
 
 }  // namespace
