@@ -12,6 +12,7 @@
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/Nginx.h"
 #include "tests/integration/TestClient.h"
+#include "tests/receiver/ReceiverProcess.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/TestHTTPServer.h"
 
@@ -102,6 +103,23 @@ TEST_F(LoadBalancer, WithTheDocumentedLinesADeadUpstreamCostsOnePostAndNoBackEnd
   postTwice();
   EXPECT_EQ(lastAnswer(), "429");
   EXPECT_TRUE(secondArrived()) << daemon_.log();
+}
+
+TEST_F(LoadBalancer, AReceiverWithoutLogAndRoomCostsOnePostAndNoBackEnd) {
+  receiver::ReceiverProcess::Options options;
+  options.servers = "[\"nats://127.0.0.1:9\"]";  // nobody
+  options.spoolMaxBytes = 1 << 20;
+  receiver::ReceiverProcess receiver(options);
+  ASSERT_TRUE(receiver.isReady()) << receiver.output();
+  uint64_t number = 0;
+  for (const size_t size : {100'000, 1'000, 0})
+    ASSERT_TRUE(eventually([&] { return receiver.post(receiver::postText(++number, size)).status == 429; }));
+  const double before = receiver.metric("kyt_refused_total{reason=\"spool-full\"}").value_or(0);
+  start(documentedLines("http://127.0.0.1:" + std::to_string(receiver.port())));
+  postTwice();
+  EXPECT_EQ(lastAnswer(), "429");
+  EXPECT_TRUE(secondArrived()) << daemon_.log();
+  EXPECT_EQ(receiver.metric("kyt_refused_total{reason=\"spool-full\"}"), before + 1);
 }
 
 TEST_F(LoadBalancer, WithTheDocumentedLinesAFullDiskOfItsOwnIsA429) {
