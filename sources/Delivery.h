@@ -1,5 +1,9 @@
 // Hands one report to the daemon: a session of its own for each, so that a source holds no connection in between and the
 // daemon may end when it is idle. One thread; blocks.
+//
+// Where the daemon has no storebag for the client type (a device that starts before its network does) it would drop what it
+// is given: nothing is handed over then. Without the owner's consent it drops as well, but that is silence for good: it
+// counts as taken.
 #pragma once
 
 #include <chrono>
@@ -10,18 +14,26 @@
 
 namespace kyt::sources {
 
+// What became of a report.
+struct Handover {
+  bool offered = false;  // false: the daemon was given nothing of it
+  std::vector<bool>
+      taken;  // of each event, whether the daemon says so; one that was offered and is not may be
+  [[nodiscard]] bool isWhole() const;
+};
+
 class Delivery {
  public:
   struct Options {
     std::string socket;  // empty: as the client library finds it
     std::string client;  // "ClientName", the program's own name
     uint8_t clientType = 0;
-    std::chrono::milliseconds patience = std::chrono::seconds(30);  // for all of one report
+    std::chrono::milliseconds patience =
+        std::chrono::seconds(30);  // for all of one report, the goodbye included
   };
   explicit Delivery(Options options) : options_(std::move(options)) {}
-  // Which of the events the daemon has taken. What it does with them (the owner's consent, filters, the network) is its
-  // own, and in its books.
-  [[nodiscard]] std::vector<bool> deliver(const std::vector<SourceEvent>& events);
+  // What the daemon does with what it has taken (the owner's consent, filters, the network) is its own, and in its books.
+  [[nodiscard]] Handover deliver(const std::vector<SourceEvent>& events);
   // Why the last report was not taken whole; empty: it was.
   [[nodiscard]] const std::string& problem() const { return problem_; }
 

@@ -2,8 +2,10 @@
 // the sum over once a period. One thread.
 //
 // What is read and not delivered is read again after a restart, from the state's position on, so nothing is lost; what
-// was delivered is not told again. After a hard end between the two a report comes once more, with the same number and
-// at least the same contents.
+// was delivered is not told again. A report that the daemon was given and did not take whole is tried again as it is, under
+// its number, over a restart too; what is found meanwhile is the next one's. After a hard end (a power cut, a kill) between
+// the handing over and the word of it in the state file a report comes once more, with the same number and at least the
+// same contents.
 #pragma once
 
 #include <chrono>
@@ -12,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "sources/Delivery.h"
 #include "sources/Journal.h"
 #include "sources/State.h"
 #include "sources/Summary.h"
@@ -25,8 +28,7 @@ struct Finding {
 };
 using FieldReader = std::function<std::string(const char* name)>;
 using Finder = std::function<std::optional<Finding>(const FieldReader& field)>;
-// Which of the events were taken.
-using Deliver = std::function<std::vector<bool>(const std::vector<SourceEvent>&)>;
+using Deliver = std::function<Handover(const std::vector<SourceEvent>&)>;
 
 class Follower {
  public:
@@ -44,16 +46,28 @@ class Follower {
   void look();
   // Whether the last look left entries unread.
   [[nodiscard]] bool isBehind() const { return behind_; }
-  [[nodiscard]] bool hasFindings() const { return !summary_.empty(); }
+  [[nodiscard]] bool hasFindings() const { return begun_ || !summary_.empty(); }
   // Whether all was taken. What was not waits, and grows by no more than the summary's bounds.
   [[nodiscard]] bool report();
   // Why the state could not be written, last; empty: it could.
   [[nodiscard]] const std::string& stateProblem() const { return stateProblem_; }
 
  private:
+  // A report of which the daemon was given something: the events that it has not said to have taken.
+  struct Begun {
+    std::vector<SourceEvent> events;
+    std::string until;  // the position that its taking reaches
+  };
   void begin();
+  [[nodiscard]] bool goToPosition();
   void take();
   void goToThePresent();
+  // Whether what is read was read before, for a report that an earlier run began.
+  [[nodiscard]] bool isReadingAgain() const { return !state_.until.empty() && !begun_; }
+  [[nodiscard]] bool isPastWhatWasBegun() const;
+  void closeWhatWasBegun();
+  [[nodiscard]] bool reportBegun();
+  [[nodiscard]] bool settle(const std::vector<bool>& taken);
   void writeDown();
 
   Journal& journal_;
@@ -62,7 +76,9 @@ class Follower {
   const Deliver deliver_;
   const std::function<uint64_t()> now_;
   Summary summary_;
-  State state_;
+  std::optional<Begun> begun_;
+  State state_;       // as in the file
+  std::string read_;  // the position that was read to
   std::string stateProblem_;
   std::optional<CursorPlace> unreadFrom_;  // entries from here to the next one that is read count as unread
   bool behind_ = false;

@@ -23,12 +23,16 @@ std::optional<State> readState(const std::string& path) {
   if (file == nullptr) return std::nullopt;
   const std::string& text = file->bytes;
   const size_t line = text.find('\n');
-  if (line == std::string::npos || text.back() != '\n' || text.find('\n', line + 1) != text.size() - 1)
-    return std::nullopt;
+  if (line == std::string::npos || text.back() != '\n') return std::nullopt;
+  const size_t end = text.find('\n', line + 1);
+  if (end == std::string::npos) return std::nullopt;
   State state;
   const auto number = std::from_chars(text.data(), text.data() + line, state.report);
   if (number.ec != std::errc() || number.ptr != text.data() + line) return std::nullopt;
-  state.position = text.substr(line + 1, text.size() - line - 2);
+  state.position = text.substr(line + 1, end - line - 1);
+  if (end == text.size() - 1) return state;
+  if (text.find('\n', end + 1) != text.size() - 1) return std::nullopt;
+  state.until = text.substr(end + 1, text.size() - end - 2);
   return state;
 }
 
@@ -39,7 +43,8 @@ std::optional<std::string> writeState(const std::string& path, const State& stat
     const Descriptor file =
         ownDescriptor(::open(fresh.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
     if (!file) return failed(errno);
-    const std::string text = std::to_string(state.report) + "\n" + state.position + "\n";
+    std::string text = std::to_string(state.report) + "\n" + state.position + "\n";
+    if (!state.until.empty()) text += state.until + "\n";
     if (!writeAll(file.get(), text) || ::fsync(file.get()) != 0) return failed(errno);
   }
   if (std::rename(fresh.c_str(), path.c_str()) != 0) return failed(errno);

@@ -1,4 +1,4 @@
-// How far a source has reported: a file of two lines, replaced as a whole, so that a crash at any point leaves the old
+// How far a source has reported: a file of two or three lines, replaced as a whole, so that a crash at any point leaves the old
 // one or the new one. One thread.
 #pragma once
 
@@ -9,10 +9,12 @@
 namespace kyt::sources {
 
 struct State {
-  // Of the next report. One that is made again after a hard end has the number of the first.
+  // Of the next report. One that is made again has the number of the first.
   uint64_t report = 1;
   // Where the journal was read to: a cursor, or "@" and microseconds since 1970 before anything was found.
   std::string position;
+  // Where the journal was read to when that report was handed over and not taken whole, likewise; else empty.
+  std::string until;
   friend bool operator==(const State&, const State&) = default;
 };
 

@@ -44,12 +44,9 @@ std::vector<SourceEvent> Summary::events(uint64_t report) const {
   return events;
 }
 
-void Summary::forget(const std::vector<bool>& delivered) {
-  size_t index = 0;
-  const auto wasDelivered = [&] { return index < delivered.size() && delivered[index++]; };
-  for (auto row = rows_.begin(); row != rows_.end();)
-    row = wasDelivered() ? rows_.erase(row) : std::next(row);
-  if (hasNotTold() && wasDelivered()) others_ = unread_ = waits_ = 0;
+void Summary::clear() {
+  rows_.clear();
+  others_ = unread_ = waits_ = 0;
 }
 
 }  // namespace kyt::sources

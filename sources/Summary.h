@@ -27,19 +27,18 @@ class Summary {
   explicit Summary(uint32_t category) : category_(category) {}
   // Rows of their own; a device where more units fail at once has another problem than which.
   static constexpr size_t kMostRows = 200;
-  // The type of the event that counts what has no row, what nobody read, and how often a report found no daemon.
+  // The type of the event that counts what has no row, what nobody read, and how often a report was not taken.
   static constexpr uint32_t kNotTold = 9;
 
   // One finding of that type, told apart by its fields; the time is in microseconds since 1970.
   void add(uint32_t type, const Dictionary& fields, uint64_t microseconds);
   // Journal entries that nobody read.
   void addUnread(uint64_t entries) { unread_ += entries; }
-  // A report that could not be delivered, and is made again later.
+  // A report that was not taken, and is tried again later.
   void addWait() { ++waits_; }
   // The rows as events: each with "count", "first" and "last" (whole seconds since 1970), and the report's number.
   [[nodiscard]] std::vector<SourceEvent> events(uint64_t report) const;
-  // Forgets the rows whose events were delivered, in the order of events().
-  void forget(const std::vector<bool>& delivered);
+  void clear();
   [[nodiscard]] bool empty() const { return rows_.empty() && !hasNotTold(); }
 
  private:

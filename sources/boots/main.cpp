@@ -102,9 +102,7 @@ class Boots {
     if (ended.boots.size() > kMostBoots)
       ended.boots.erase(ended.boots.begin(), ended.boots.end() - static_cast<ptrdiff_t>(kMostBoots));
     const std::vector<SourceEvent> found = eventsOf(ended.boots, told.began != current_, state.report);
-    const std::vector<bool> taken = delivery_.deliver(found);
-    if (std::find(taken.begin(), taken.end(), false) != taken.end())
-      return tell("the report waits: " + delivery_.problem());
+    if (!delivery_.deliver(found).isWhole()) return tell("the report waits: " + delivery_.problem());
     if (!found.empty()) ++state.report;
     state.position = "@" + std::to_string(told.until) + ";" + current_;
     if (const auto problem = writeState(options_.state, state)) tell(*problem);

@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <optional>
 
 #include "platform/base/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
@@ -60,19 +61,25 @@ class Resources {
 
  private:
   void report() {
+    if (begun_ && !handOver(*begun_).isWhole()) return;
+    begun_.reset();
     Dictionary fields = period_.summary();
     fields.set("waits", waits_);
     fields.set("report", state_.report);
-    const std::vector<bool> taken = delivery_.deliver({{kCategory, kResources, std::move(fields)}});
-    if (!taken.front()) {
-      ++waits_;
-      tell("the summary waits: " + delivery_.problem());
-      return;
-    }
-    waits_ = 0;
+    SourceEvent event{kCategory, kResources, std::move(fields)};
+    const Handover handover = handOver(event);
+    if (!handover.offered) return;
     period_.restart();
+    // Its number is used, whatever became of it.
     ++state_.report;
-    tell(writeState(options_.state, state_).value_or(std::string()));
+    if (const auto problem = writeState(options_.state, state_)) tell(*problem);
+    if (!handover.isWhole()) begun_ = std::move(event);
+  }
+  Handover handOver(const SourceEvent& event) {
+    Handover handover = delivery_.deliver({event});
+    waits_ = handover.isWhole() ? 0 : waits_ + 1;
+    tell(handover.isWhole() ? std::string() : "the summary waits: " + delivery_.problem());
+    return handover;
   }
   // Once for each problem, however long it lasts.
   void tell(std::string problem) {
@@ -85,6 +92,8 @@ class Resources {
   Delivery delivery_;
   ResourcePeriod period_;
   State state_;
+  // Handed over, and the daemon did not say that it has it: it is tried again as it is.
+  std::optional<SourceEvent> begun_;
   uint64_t waits_ = 0;
   std::string told_;
 };

@@ -214,6 +214,30 @@ TEST_F(BootsSource, ReportsEachRunOnceWithTheFieldsThatItsEventsFileNames) {
   EXPECT_EQ(startups, 1);
 }
 
+TEST_F(BootsSource, ReportsOnceTheDaemonHasAStorebagWhatItFoundBefore) {
+  lay("boots", "gelmar");
+  run(kFirst);
+  journal_.write();
+  const auto start = [&] {
+    return SourceOnAStage::run({"--journal", journal_.folder(), "--state", folder_ / "state", "--boot",
+                                kSecond, "--patience", "60"});
+  };
+  // As on a device that starts before its network does.
+  ASSERT_TRUE(stage_->control("/control/reply", R"({"path":"/bags/tolvar/gelmar","close":true,"times":0})"));
+  const ProgramRun early = start();
+  EXPECT_EQ(early.status, 1);
+  EXPECT_NE(early.text.find("the report waits: "), std::string::npos) << early.text;
+  EXPECT_NE(early.text.find("storebag"), std::string::npos) << early.text;
+  EXPECT_FALSE(std::filesystem::exists(folder_ / "state"));
+  ASSERT_TRUE(stage_->control("/control/reset", ""));
+  // The daemon does not ask again for a quarter of an hour; a fresh one does.
+  EXPECT_EQ(stage_->stopDaemon(std::chrono::seconds(30)).value_or(-1), 0);
+  ASSERT_FALSE(stage_->startDaemon());
+  const ProgramRun later = start();
+  EXPECT_EQ(later.status, 0) << later.text;
+  EXPECT_EQ(arrived(303, 1).size(), 1U);
+}
+
 TEST_F(BootsSource, KeepsItsPlaceWhereThereIsNoDaemon) {
   run(kFirst);
   journal_.write();

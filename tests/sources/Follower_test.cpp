@@ -39,9 +39,11 @@ class FollowedJournal : public ::testing::Test {
     follower_ = std::make_unique<Follower>(
         *journal_, options, unitsProgram().finder({units_.path()}),
         [this](const std::vector<SourceEvent>& events) {
-          if (!daemonIsThere_) return std::vector<bool>(events.size(), false);
+          Handover handover{daemonIsThere_, std::vector<bool>(events.size(), daemonIsThere_)};
+          if (!daemonIsThere_) return handover;
+          if (takesTheFirstAlone_) std::fill(handover.taken.begin() + 1, handover.taken.end(), false);
           delivered_.insert(delivered_.end(), events.begin(), events.end());
-          return std::vector<bool>(events.size(), true);
+          return handover;
         },
         [this] { return now_; });
   }
@@ -60,12 +62,20 @@ class FollowedJournal : public ::testing::Test {
     delivered_.clear();
     return lines;
   }
+  // The same with the report's number.
+  std::vector<std::string> toldWithNumbers() {
+    std::vector<int> numbers;
+    for (const SourceEvent& event : delivered_) numbers.push_back(event.payload.integer("report"));
+    std::vector<std::string> lines = told();
+    for (size_t i = 0; i < lines.size(); ++i) lines[i] += " of " + std::to_string(numbers[i]);
+    return lines;
+  }
   using Lines = std::vector<std::string>;
 
   WrittenJournal written_;
   TemporaryFolder units_, state_;
   microseconds budget_ = seconds(60);
-  bool daemonIsThere_ = true;
+  bool daemonIsThere_ = true, takesTheFirstAlone_ = false;
   uint64_t now_ = 0;
   std::vector<SourceEvent> delivered_;
   std::unique_ptr<Journal> journal_;
@@ -140,6 +150,68 @@ TEST_F(FollowedJournal, WaitsForTheDaemonWithoutGrowingAndCountsIt) {
   ASSERT_EQ(delivered_.size(), 2U);
   EXPECT_EQ(delivered_[1].payload.integer("waits"), 3);
   EXPECT_EQ(told(), (Lines{"1 cron.service 3", "9 - 0"}));
+}
+
+TEST_F(FollowedJournal, TriesTheRestOfAReportThatWasTakenInPartAgainAsItWas) {
+  start();
+  written_.add(failureOf("cron.service"));
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  look();
+  takesTheFirstAlone_ = true;
+  EXPECT_FALSE(follower_->report());
+  EXPECT_EQ(toldWithNumbers(), (Lines{"1 cron.service 1 of 1", "1 ssh.service 1 of 1"}));
+  takesTheFirstAlone_ = false;
+  written_.add(failureOf("cron.service"));
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  look();
+  EXPECT_TRUE(follower_->hasFindings());
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(toldWithNumbers(),
+            (Lines{"1 ssh.service 1 of 1", "1 cron.service 1 of 2", "1 ssh.service 1 of 2", "9 - 0 of 2"}));
+  EXPECT_FALSE(follower_->hasFindings());
+}
+
+TEST_F(FollowedJournal, TellsAReportThatWasTakenInPartOverARestartWithTheSameContents) {
+  start();
+  written_.add(failureOf("cron.service"));
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  look();
+  takesTheFirstAlone_ = true;
+  EXPECT_FALSE(follower_->report());
+  const Lines first = toldWithNumbers();
+  takesTheFirstAlone_ = false;
+  written_.add(failureOf("cron.service"));
+  written_.write();
+  start();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(told(), Lines()) << "what was begun is not read again yet";
+  look();
+  EXPECT_TRUE(follower_->report());
+  Lines all = first;
+  all.emplace_back("1 cron.service 1 of 2");
+  EXPECT_EQ(toldWithNumbers(), all);
+  start();
+  look();
+  EXPECT_FALSE(follower_->hasFindings());
+}
+
+TEST_F(FollowedJournal, TellsAReportThatWasTakenInPartAgainWhereNothingCameBehindIt) {
+  start();
+  written_.add(failureOf("cron.service"));
+  written_.add(failureOf("ssh.service"));
+  written_.write();
+  look();
+  takesTheFirstAlone_ = true;
+  EXPECT_FALSE(follower_->report());
+  const Lines first = toldWithNumbers();
+  takesTheFirstAlone_ = false;
+  start();
+  look();
+  EXPECT_TRUE(follower_->report());
+  EXPECT_EQ(toldWithNumbers(), first);
 }
 
 TEST_F(FollowedJournal, ReadsAgainAfterARestartWhatFoundNoDaemon) {

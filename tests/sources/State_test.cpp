@@ -10,17 +10,20 @@ namespace {
 
 TEST(SourceState, IsReadAsItWasWritten) {
   const TemporaryFolder folder;
-  const State state{42, "s=12;i=3;t=5"};
+  const State state{42, "s=12;i=3;t=5", ""};
   EXPECT_EQ(writeState(folder / "state", state), std::nullopt);
   EXPECT_EQ(readState(folder / "state"), state);
-  EXPECT_EQ(writeState(folder / "state", State{43, ""}), std::nullopt);
-  EXPECT_EQ(readState(folder / "state"), (State{43, ""}));
+  EXPECT_EQ(writeState(folder / "state", State{43, "", ""}), std::nullopt);
+  EXPECT_EQ(readState(folder / "state"), (State{43, "", ""}));
+  const State begun{44, "@5", "s=12;i=4;t=6"};
+  EXPECT_EQ(writeState(folder / "state", begun), std::nullopt);
+  EXPECT_EQ(readState(folder / "state"), begun);
 }
 
 TEST(SourceState, IsNoneWhereTheFileHoldsSomethingElse) {
   const TemporaryFolder folder;
   EXPECT_EQ(readState(folder / "none"), std::nullopt);
-  for (const char* text : {"", "1", "1\ncursor", "x\ncursor\n", "1x\ncursor\n", "1\na\nb\n"}) {
+  for (const char* text : {"", "1", "1\ncursor", "x\ncursor\n", "1x\ncursor\n", "1\na\nb", "1\na\nb\nc\n"}) {
     EXPECT_EQ(readState(folder.write("state", text)), std::nullopt) << text;
   }
 }
