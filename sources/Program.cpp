@@ -21,7 +21,7 @@ constexpr seconds kLookInterval{5};
 
 struct Options {
   std::string journal, socket, state;
-  std::vector<std::string> unitFolders;
+  SystemNames::Options names{{}, "/var/lib/dpkg/info", {}};
   int period = 900, clientType = 0, patience = 30;
   bool once = false;
 };
@@ -53,7 +53,7 @@ class Run {
     }
     Journal& journal = *std::get<std::unique_ptr<Journal>>(opened);
     Follower follower(
-        journal, {options_.state, program_.category}, program_.finder(options_.unitFolders),
+        journal, {options_.state, program_.category}, program_.finder(options_.names),
         [this](const std::vector<SourceEvent>& events) { return delivery_.deliver(events); },
         microsecondsSince1970);
     return options_.once ? once(follower) : follow(journal, follower);
@@ -124,12 +124,14 @@ int runJournalProgram(const JournalProgram& program, int argc, char** argv) {
   line.option("--socket", options.socket, "The daemon's socket");
   line.option("--state", options.state, "The file that says what was reported").showsDefault();
   line.option("--journal", options.journal, "A folder of journal files in place of this machine's");
-  line.option("--units-from", options.unitFolders,
+  line.option("--units-from", options.names.unitFolders,
               "A folder of units that a report may name (/usr/lib/systemd/system)")
       .repeatable();
+  line.option("--packages", options.names.packages, "A folder with the packages' lists of files")
+      .showsDefault();
   line.flag("--once", options.once, "Report what is there, and end");
   if (const auto status = line.parse(argc, argv)) return *status;
-  if (options.unitFolders.empty()) options.unitFolders.emplace_back("/usr/lib/systemd/system");
+  if (options.names.unitFolders.empty()) options.names.unitFolders.emplace_back("/usr/lib/systemd/system");
   Waiting waiting;
   if (!waiting.works()) return 1;
   return Run(program, options, waiting).run();

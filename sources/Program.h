@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "sources/Follower.h"
+#include "sources/Names.h"
 
 namespace kyt::sources {
 
@@ -18,8 +19,8 @@ struct JournalProgram {
   uint8_t clientType = 0;  // where the command line names none
   bool systemAlone = true;
   std::vector<std::string> matches;
-  // What it finds; told the folders of the units that a report may name.
-  std::function<Finder(std::vector<std::string> unitFolders)> finder;
+  // What it finds; told what a report may name.
+  std::function<Finder(SystemNames::Options)> finder;
 };
 // The exit status: 0 after SIGTERM or SIGINT, 1 when the journal cannot be read (with --once: or the report was not
 // taken), 2 when the command line is wrong.

@@ -1,6 +1,7 @@
 #include "sources/crashes/CrashFindings.h"
 
 #include <charconv>
+#include <memory>
 
 #include "sources/Names.h"
 
@@ -11,6 +12,8 @@ namespace {
 constexpr uint32_t kCategory = 302;
 constexpr uint8_t kClientType = 10;
 constexpr char kCoredump[] = "fc2e22bc6ee647b6b90729ab34a250b1";
+// The services that systemd starts for crashes are in this slice, and nobody else's programs are.
+constexpr char kSlice[] = "system-systemd\\x2dcoredump.slice";
 constexpr int kHighestSignal = 64;
 
 int signalOf(const std::string& text) {
@@ -19,13 +22,13 @@ int signalOf(const std::string& text) {
   return read.ec == std::errc() && number > 0 && number <= kHighestSignal ? number : 0;
 }
 
-std::optional<Finding> crashFinding(const FieldReader& field, const std::vector<std::string>& folders) {
-  // The journal itself says of which unit the writer was: anyone may write an entry with this identifier.
+std::optional<Finding> crashFinding(const FieldReader& field, SystemNames& names) {
+  // The journal itself says of which unit the writer was.
   if (!field("_SYSTEMD_UNIT").starts_with("systemd-coredump@")) return std::nullopt;
   const std::string unit = field("COREDUMP_UNIT");
   return Finding{kProgramCrashed,
-                 {{"program", reportedProgram(field("COREDUMP_EXE"))},
-                  {"unit", unit.empty() ? std::string("(none)") : reportedUnit(unit, folders)},
+                 {{"program", names.program(field("COREDUMP_EXE"))},
+                  {"unit", unit.empty() ? std::string("(none)") : names.unit(unit)},
                   {"signal", signalOf(field("COREDUMP_SIGNAL"))}}};
 }
 
@@ -39,9 +42,12 @@ JournalProgram crashesProgram() {
   program.clientType = kClientType;
   // The crash of a person's program stands in that person's journal.
   program.systemAlone = false;
-  program.matches = {std::string("MESSAGE_ID=") + kCoredump};
-  program.finder = [](std::vector<std::string> folders) {
-    return [folders = std::move(folders)](const FieldReader& field) { return crashFinding(field, folders); };
+  // By the journal's index: the entries that anyone may write with this identifier are not even read.
+  program.matches = {std::string("MESSAGE_ID=") + kCoredump, std::string("_SYSTEMD_SLICE=") + kSlice};
+  program.finder = [](SystemNames::Options options) {
+    return [names = std::make_shared<SystemNames>(std::move(options))](const FieldReader& field) {
+      return crashFinding(field, *names);
+    };
   };
   return program;
 }

@@ -1,6 +1,7 @@
 #include "sources/units/UnitFindings.h"
 
 #include <algorithm>
+#include <memory>
 
 #include "sources/Names.h"
 
@@ -22,13 +23,12 @@ std::string resultOf(const std::string& text) {
   return isWord ? text : "unknown";
 }
 
-std::optional<Finding> unitFinding(const FieldReader& field, const std::vector<std::string>& folders) {
+std::optional<Finding> unitFinding(const FieldReader& field, SystemNames& names) {
   const std::string unit = field("UNIT"), message = field("MESSAGE_ID");
   if (unit.empty()) return std::nullopt;
   if (message == kFailure)
-    return Finding{kUnitFailed,
-                   {{"unit", reportedUnit(unit, folders)}, {"result", resultOf(field("UNIT_RESULT"))}}};
-  if (message == kRestart) return Finding{kUnitRestarted, {{"unit", reportedUnit(unit, folders)}}};
+    return Finding{kUnitFailed, {{"unit", names.unit(unit)}, {"result", resultOf(field("UNIT_RESULT"))}}};
+  if (message == kRestart) return Finding{kUnitRestarted, {{"unit", names.unit(unit)}}};
   return std::nullopt;
 }
 
@@ -42,8 +42,10 @@ JournalProgram unitsProgram() {
   program.clientType = kClientType;
   // The journal itself says who wrote an entry: anyone may write one with these identifiers.
   program.matches = {"_PID=1", std::string("MESSAGE_ID=") + kFailure, std::string("MESSAGE_ID=") + kRestart};
-  program.finder = [](std::vector<std::string> folders) {
-    return [folders = std::move(folders)](const FieldReader& field) { return unitFinding(field, folders); };
+  program.finder = [](SystemNames::Options options) {
+    return [names = std::make_shared<SystemNames>(std::move(options))](const FieldReader& field) {
+      return unitFinding(field, *names);
+    };
   };
   return program;
 }

@@ -37,7 +37,7 @@ class FollowedJournal : public ::testing::Test {
     options.category = 301;
     options.lookBudget = budget_;
     follower_ = std::make_unique<Follower>(
-        *journal_, options, unitsProgram().finder({units_.path()}),
+        *journal_, options, unitsProgram().finder({{units_.path()}, {}, {}}),
         [this](const std::vector<SourceEvent>& events) {
           Handover handover{daemonIsThere_, std::vector<bool>(events.size(), daemonIsThere_)};
           if (!daemonIsThere_) return handover;

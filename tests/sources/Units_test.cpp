@@ -20,7 +20,8 @@ class UnitsSource : public SourceOnAStage {
     folder_.write("state", "1\n@1\n");
   }
   [[nodiscard]] std::vector<std::string> arguments() const {
-    return {"--journal", journal_.folder(), "--state", folder_ / "state", "--units-from", folder_ / "units"};
+    return {"--journal",    journal_.folder(), "--state",    folder_ / "state",
+            "--units-from", folder_ / "units", "--packages", folder_ / "none"};
   }
   [[nodiscard]] std::vector<Dictionary> arrivedUnits(int count) const { return arrived(301, count); }
   WrittenJournal journal_;
@@ -86,7 +87,7 @@ TEST_F(UnitsSource, FollowsTheJournalUntilItIsToldToEndAndReportsThenWhatItFound
 }
 
 TEST_F(UnitsSource, ReportsTheFieldsThatItsEventsFileNames) {
-  const auto finder = sources::unitsProgram().finder({folder_ / "units"});
+  const auto finder = sources::unitsProgram().finder({{folder_ / "units"}, {}, {}});
   sources::Summary summary(sources::unitsProgram().category);
   for (const auto& entry : {failureOf("cron.service"), restartOf("cron.service")}) {
     const auto finding = finder([&](const char* name) {
