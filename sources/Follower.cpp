@@ -41,7 +41,8 @@ Follower::Follower(Journal& journal, Options options, Finder finder, Deliver del
 }
 
 void Follower::begin() {
-  if (const auto state = readState(options_.stateFile)) state_ = *state;
+  const auto now = std::chrono::microseconds(now_());
+  state_ = stateAtStart(options_.stateFile, std::chrono::floor<std::chrono::seconds>(now), startProblem_);
   if (goToPosition()) {
     read_ = state_.position;
     return;

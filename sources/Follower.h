@@ -49,6 +49,8 @@ class Follower {
   [[nodiscard]] bool hasFindings() const { return begun_ || !summary_.empty(); }
   // Whether all was taken. What was not waits, and grows by no more than the summary's bounds.
   [[nodiscard]] bool report();
+  // What was found in the place of a state; empty: nothing, or one.
+  [[nodiscard]] const std::string& startProblem() const { return startProblem_; }
   // Why the state could not be written, last; empty: it could.
   [[nodiscard]] const std::string& stateProblem() const { return stateProblem_; }
 
@@ -79,7 +81,7 @@ class Follower {
   std::optional<Begun> begun_;
   State state_;       // as in the file
   std::string read_;  // the position that was read to
-  std::string stateProblem_;
+  std::string startProblem_, stateProblem_;
   std::optional<CursorPlace> unreadFrom_;  // entries from here to the next one that is read count as unread
   bool behind_ = false;
 };

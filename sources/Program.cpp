@@ -1,13 +1,10 @@
 #include "sources/Program.h"
 
 #include <chrono>
-#include <cstdio>
-#include <cstdlib>
 #include <optional>
 
-#include "platform/base/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
-#include "sources/Delivery.h"
+#include "sources/Common.h"
 #include "sources/Waiting.h"
 
 namespace kyt::sources {
@@ -20,21 +17,12 @@ using std::chrono::steady_clock;
 constexpr seconds kLookInterval{5};
 
 struct Options {
-  std::string journal, socket, state;
+  CommonOptions common;
+  std::string journal;
   SystemNames::Options names{{}, "/var/lib/dpkg/info", {}};
-  int period = 900, clientType = 0, patience = 30;
+  int period = 900;
   bool once = false;
 };
-
-uint64_t microsecondsSince1970() {
-  const auto time = std::chrono::system_clock::now().time_since_epoch();
-  return static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::microseconds>(time).count());
-}
-
-std::string stateFile(const JournalProgram& program) {
-  const char* folder = std::getenv("STATE_DIRECTORY");
-  return (folder != nullptr ? std::string(folder) : std::string("/var/lib/") + program.name) + "/state";
-}
 
 class Run {
  public:
@@ -42,20 +30,21 @@ class Run {
       : program_(program),
         options_(options),
         waiting_(waiting),
-        delivery_({options.socket, program.name, static_cast<uint8_t>(options.clientType),
-                   seconds(options.patience)}) {}
+        delivery_(options.common.delivery()),
+        voice_(program.name) {}
 
   int run() {
     auto opened = Journal::open({options_.journal, program_.systemAlone, program_.matches});
     if (const auto* why = std::get_if<std::string>(&opened)) {
-      say(*why);
+      voice_.say(*why);
       return 1;
     }
     Journal& journal = *std::get<std::unique_ptr<Journal>>(opened);
     Follower follower(
-        journal, {options_.state, program_.category}, program_.finder(options_.names),
+        journal, {options_.common.state, program_.category}, program_.finder(options_.names),
         [this](const std::vector<SourceEvent>& events) { return delivery_.deliver(events); },
-        microsecondsSince1970);
+        [] { return static_cast<uint64_t>(since1970().count()); });
+    if (!follower.startProblem().empty()) voice_.say(follower.startProblem());
     return options_.once ? once(follower) : follow(journal, follower);
   }
 
@@ -87,42 +76,27 @@ class Run {
   }
   bool report(Follower& follower) {
     const bool taken = follower.report();
-    tell(taken ? std::string() : "what was found waits, summed up: " + delivery_.problem());
-    if (!follower.stateProblem().empty()) say(follower.stateProblem());
+    voice_.tell(taken ? std::string() : "what was found waits, summed up: " + delivery_.problem());
+    if (!follower.stateProblem().empty()) voice_.say(follower.stateProblem());
     return taken;
-  }
-  // Once for each problem, however long it lasts.
-  void tell(std::string problem) {
-    if (!problem.empty() && problem != told_) say(problem);
-    told_ = std::move(problem);
-  }
-  void say(const std::string& text) const {
-    std::fprintf(stderr, "%s: %s\n", program_.name, escapedText(text).c_str());
   }
 
   const JournalProgram& program_;
   const Options& options_;
   Waiting& waiting_;
   Delivery delivery_;
-  std::string told_;
+  Voice voice_;
 };
 
 }  // namespace
 
 int runJournalProgram(const JournalProgram& program, int argc, char** argv) {
-  Options options;
-  options.clientType = program.clientType;
-  options.state = stateFile(program);
+  Options options{.common = {program.name, program.clientType}, .journal = {}};
   const CommandLine line(program.name, program.description);
   line.option("--period", options.period, "Seconds from what was found to its report")
       .between(1, 86400)
       .showsDefault();
-  line.option("--client-type", options.clientType, "The session's client type").between(5, 23).showsDefault();
-  line.option("--patience", options.patience, "Seconds that a report may take")
-      .between(1, 300)
-      .showsDefault();
-  line.option("--socket", options.socket, "The daemon's socket");
-  line.option("--state", options.state, "The file that says what was reported").showsDefault();
+  options.common.addTo(line);
   line.option("--journal", options.journal, "A folder of journal files in place of this machine's");
   line.option("--units-from", options.names.unitFolders,
               "A folder of units that a report may name (/usr/lib/systemd/system)")

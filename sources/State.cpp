@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
@@ -33,6 +34,16 @@ std::optional<State> readState(const std::string& path) {
   if (end == text.size() - 1) return state;
   if (text.find('\n', end + 1) != text.size() - 1) return std::nullopt;
   state.until = text.substr(end + 1, text.size() - end - 2);
+  return state;
+}
+
+State stateAtStart(const std::string& path, std::chrono::seconds since1970, std::string& problem) {
+  if (auto state = readState(path)) return *std::move(state);
+  if (::access(path.c_str(), F_OK) == 0)
+    problem = path + " cannot be read as a state: what was told is not known, and reports are numbered anew";
+  const auto day = std::chrono::floor<std::chrono::days>(since1970);
+  State state;
+  state.report = std::max<uint64_t>(1, static_cast<uint64_t>(std::chrono::seconds(day).count()));
   return state;
 }
 

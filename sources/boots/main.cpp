@@ -3,15 +3,12 @@
 #include <algorithm>
 #include <charconv>
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 
-#include "platform/base/TextEscape.h"
 #include "platform/linux/cli/CommandLine.h"
-#include "sources/Delivery.h"
-#include "sources/State.h"
+#include "sources/Common.h"
 #include "sources/Waiting.h"
 #include "sources/boots/EndedBoots.h"
 #include "sources/boots/Events.h"
@@ -27,8 +24,9 @@ constexpr uint64_t kMicroseconds = 1'000'000;
 constexpr size_t kMostBoots = 100;  // in one report; of more, the latest
 
 struct Options {
-  std::string socket, state, journal, root, pstore, boot;
-  int clientType = 12, patience = 30, settle = 300, retry = 900;
+  CommonOptions common{kName, 12};
+  std::string journal, root, pstore, boot;
+  int settle = 300, retry = 900;
   bool once = false;
 };
 
@@ -71,8 +69,8 @@ class Boots {
   explicit Boots(const Options& options)
       : options_(options),
         current_(options.boot.empty() ? currentBoot(options) : options.boot),
-        delivery_(
-            {options.socket, kName, static_cast<uint8_t>(options.clientType), seconds(options.patience)}) {}
+        delivery_(options.common.delivery()),
+        state_(stateAtStart(options.common, voice_)) {}
 
   int run(Waiting& waiting) {
     // Until the service manager is done with the start, so that it can say how long that took.
@@ -89,9 +87,8 @@ class Boots {
 
  private:
   bool report() {
-    State state = readState(options_.state).value_or(State{});
-    Told told = toldBy(state.position);
-    const bool isFirst = state.position.empty();
+    Told told = toldBy(state_.position);
+    const bool isFirst = state_.position.empty();
     EndedBoots ended = endedBoots(
         options_.journal, current_, told.until,
         {watchdogFired(options_), panicDumps(options_.pstore.empty() ? options_.root : options_.pstore)});
@@ -101,11 +98,11 @@ class Boots {
     if (isFirst) ended.boots.clear();
     if (ended.boots.size() > kMostBoots)
       ended.boots.erase(ended.boots.begin(), ended.boots.end() - static_cast<ptrdiff_t>(kMostBoots));
-    const std::vector<SourceEvent> found = eventsOf(ended.boots, told.began != current_, state.report);
+    const std::vector<SourceEvent> found = eventsOf(ended.boots, told.began != current_, state_.report);
     if (!delivery_.deliver(found).isWhole()) return tell("the report waits: " + delivery_.problem());
-    if (!found.empty()) ++state.report;
-    state.position = "@" + std::to_string(told.until) + ";" + current_;
-    if (const auto problem = writeState(options_.state, state)) tell(*problem);
+    if (!found.empty()) ++state_.report;
+    state_.position = "@" + std::to_string(told.until) + ";" + current_;
+    if (const auto problem = writeState(options_.common.state, state_)) voice_.say(*problem);
     return true;
   }
   [[nodiscard]] std::vector<SourceEvent> eventsOf(const std::vector<EndedBoot>& boots, bool tellsBegin,
@@ -121,14 +118,16 @@ class Boots {
           .startupMilliseconds = startupMilliseconds(options_.journal, current_), .report = report}));
     return told;
   }
-  static bool tell(const std::string& problem) {
-    std::fprintf(stderr, "%s: %s\n", kName, escapedText(problem).c_str());
+  [[nodiscard]] bool tell(std::string problem) {
+    voice_.tell(std::move(problem));
     return false;
   }
 
   const Options& options_;
   const std::string current_;
+  Voice voice_{kName};
   Delivery delivery_;
+  State state_;
 };
 
 }  // namespace
@@ -137,8 +136,6 @@ class Boots {
 int main(int argc, char** argv) {
   using namespace kyt::sources;
   Options options;
-  const char* folder = std::getenv("STATE_DIRECTORY");
-  options.state = (folder != nullptr ? std::string(folder) : "/var/lib/" + std::string(kName)) + "/state";
   const kyt::CommandLine line(kName, "Reports how earlier runs of the system ended, and that it started");
   line.option("--settle", options.settle, "Seconds to wait for the end of the start")
       .between(0, 3600)
@@ -146,12 +143,7 @@ int main(int argc, char** argv) {
   line.option("--retry", options.retry, "Seconds until a report is tried again")
       .between(1, 86400)
       .showsDefault();
-  line.option("--client-type", options.clientType, "The session's client type").between(5, 23).showsDefault();
-  line.option("--patience", options.patience, "Seconds that a report may take")
-      .between(1, 300)
-      .showsDefault();
-  line.option("--socket", options.socket, "The daemon's socket");
-  line.option("--state", options.state, "The file that says what was reported").showsDefault();
+  options.common.addTo(line);
   line.option("--journal", options.journal, "A folder of journal files in place of this machine's");
   line.option("--root", options.root, "A folder in front of /proc and /sys");
   line.option("--pstore", options.pstore, "A folder in front of the kernels' dumps instead");

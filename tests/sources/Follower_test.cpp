@@ -62,15 +62,18 @@ class FollowedJournal : public ::testing::Test {
     delivered_.clear();
     return lines;
   }
-  // The same with the report's number.
+  // The same with the report's number, counted from 1.
   std::vector<std::string> toldWithNumbers() {
     std::vector<int> numbers;
-    for (const SourceEvent& event : delivered_) numbers.push_back(event.payload.integer("report"));
+    for (const SourceEvent& event : delivered_)
+      numbers.push_back(event.payload.integer("report") - kFirst + 1);
     std::vector<std::string> lines = told();
     for (size_t i = 0; i < lines.size(); ++i) lines[i] += " of " + std::to_string(numbers[i]);
     return lines;
   }
   using Lines = std::vector<std::string>;
+  // The number of the day on which the test's journal begins.
+  static constexpr int kFirst = static_cast<int>(WrittenJournal::kBegin / 86'400'000'000 * 86'400);
 
   WrittenJournal written_;
   TemporaryFolder units_, state_;
@@ -239,7 +242,7 @@ TEST_F(FollowedJournal, NumbersReportsOnOverRestarts) {
     for (const SourceEvent& event : delivered_) numbers.push_back(event.payload.integer("report"));
     delivered_.clear();
   }
-  EXPECT_EQ(numbers, (std::vector<int>{1, 2, 3}));
+  EXPECT_EQ(numbers, (std::vector<int>{kFirst, kFirst + 1, kFirst + 2}));
 }
 
 TEST_F(FollowedJournal, GivesALookThatTakesTooLongUpAndCountsTheRestAtTheNext) {

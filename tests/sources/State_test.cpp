@@ -28,6 +28,28 @@ TEST(SourceState, IsNoneWhereTheFileHoldsSomethingElse) {
   }
 }
 
+TEST(SourceState, BeginsWithTheDaysNumberSoThatNoneComesTwiceWhereItWasLost) {
+  const TemporaryFolder folder;
+  constexpr std::chrono::seconds kDay{1'760'054'400}, kTime{1'760'054'400 + 50'000};
+  std::string problem;
+  const State first = stateAtStart(folder / "none", kTime, problem);
+  EXPECT_EQ(first, (State{static_cast<uint64_t>(kDay.count()), "", ""}));
+  EXPECT_EQ(problem, "");
+  // As many reports as there can be: one a second, to the end of the day.
+  State last = first;
+  last.report += 86400 - 50'000;
+  EXPECT_EQ(writeState(folder / "state", last), std::nullopt);
+  EXPECT_EQ(stateAtStart(folder / "state", kTime, problem), last);
+  EXPECT_EQ(problem, "");
+  folder.write("state", "");
+  EXPECT_GT(stateAtStart(folder / "state", kTime + std::chrono::days(1), problem).report, last.report);
+  EXPECT_EQ(problem,
+            (folder / "state") +
+                " cannot be read as a state: what was told is not known, and reports are numbered anew");
+  EXPECT_EQ(stateAtStart(folder / "none", std::chrono::seconds(5), problem).report, 1U)
+      << "a device without a clock";
+}
+
 TEST(SourceState, SaysWhyItCannotBeWritten) {
   const TemporaryFolder folder;
   const auto problem = writeState(folder / "missing/state", {});
