@@ -2,7 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
-#include <set>
+#include <map>
 
 #include "sources/Journal.h"
 
@@ -24,8 +24,12 @@ std::unique_ptr<Journal> openJournal(const std::string& folder, std::vector<std:
   return std::get<std::unique_ptr<Journal>>(std::move(opened));
 }
 
-// Of the target that the service manager reached last, on its way to the end; empty: it reached none.
-std::string orderlyEnd(const std::string& folder, const std::string& boot, std::string& problem) {
+struct OrderlyEnd {
+  std::string
+      reason;  // of the target that the service manager reached last, on its way to the end; empty: it reached none
+  uint64_t reached = 0;  // when, the first of them
+};
+OrderlyEnd orderlyEnd(const std::string& folder, const std::string& boot, std::string& problem) {
   static constexpr std::pair<const char*, const char*> kTargets[] = {{"reboot.target", "reboot"},
                                                                      {"poweroff.target", "power-off"},
                                                                      {"halt.target", "halt"},
@@ -34,13 +38,16 @@ std::string orderlyEnd(const std::string& folder, const std::string& boot, std::
   std::vector<std::string> matches = {"_BOOT_ID=" + boot, "_PID=1", kStarted};
   for (const auto& [target, reason] : kTargets) matches.push_back(std::string("UNIT=") + target);
   const auto journal = openJournal(folder, std::move(matches), problem);
-  std::string end;
+  OrderlyEnd end;
   if (!journal) return end;
   journal->goToTime(0);
   while (journal->next()) {
     const std::string unit = journal->field("UNIT");
-    for (const auto& [target, reason] : kTargets)
-      if (unit == target && (end.empty() || std::string_view(reason) != "shutdown")) end = reason;
+    for (const auto& [target, reason] : kTargets) {
+      if (unit != target) continue;
+      if (end.reached == 0) end.reached = journal->microseconds();
+      if (end.reason.empty() || std::string_view(reason) != "shutdown") end.reason = reason;
+    }
   }
   return end;
 }
@@ -79,15 +86,19 @@ EndedBoot* runOf(std::vector<EndedBoot>& boots, uint64_t written) {
   return found;
 }
 
-// Runs of which a kernel left a panic behind. What systemd-pstore moved in the current run is of the last one; what it
-// moved before was told before.
-std::set<const EndedBoot*> panickedRuns(std::vector<EndedBoot>& boots, uint64_t currentBegan,
-                                        const PanicDumps& panics) {
-  std::set<const EndedBoot*> panicked;
+// Runs of which a kernel left a panic behind, and when the last was written; 0: nobody knows. What systemd-pstore moved in the
+// current run is of the last one; what it moved before was told before.
+std::map<const EndedBoot*, uint64_t> panickedRuns(std::vector<EndedBoot>& boots, uint64_t currentBegan,
+                                                  const PanicDumps& panics) {
+  std::map<const EndedBoot*, uint64_t> panicked;
+  const auto add = [&](const EndedBoot* boot, uint64_t when) {
+    const auto [found, isNew] = panicked.emplace(boot, when);
+    if (!isNew) found->second = found->second == 0 || when == 0 ? 0 : std::max(found->second, when);
+  };
   for (const uint64_t written : panics.written)
-    if (const EndedBoot* boot = runOf(boots, written)) panicked.insert(boot);
+    if (const EndedBoot* boot = runOf(boots, written)) add(boot, written);
   for (const uint64_t moved : panics.moved)
-    if (currentBegan != 0 && moved >= currentBegan && !boots.empty()) panicked.insert(&boots.back());
+    if (currentBegan != 0 && moved >= currentBegan && !boots.empty()) add(&boots.back(), 0);
   return panicked;
 }
 
@@ -108,13 +119,17 @@ EndedBoots endedBoots(const std::string& folder, const std::string& current, uin
             [](const EndedBoot& a, const EndedBoot& b) { return a.ended < b.ended; });
   const auto panicked = panickedRuns(result.boots, currentBegan, signs.panics);
   for (EndedBoot& boot : result.boots) {
-    boot.reason = orderlyEnd(folder, boot.boot, result.problem);
-    if (!boot.reason.empty()) continue;
+    // An end in order may fail: a kernel that panics or hangs then, the usual hang of devices, is told as that.
+    const OrderlyEnd orderly = orderlyEnd(folder, boot.boot, result.problem);
+    const auto dump = panicked.find(&boot);
+    const bool leftADump = dump != panicked.end() && (dump->second == 0 || dump->second >= orderly.reached);
     const bool isLast = &boot == &result.boots.back();
-    if (panicked.contains(&boot) || kernelPanicked(folder, boot.boot, result.problem))
+    if (leftADump || kernelPanicked(folder, boot.boot, result.problem))
       boot.reason = "panic";
+    else if (isLast && signs.watchdogFired)
+      boot.reason = "watchdog";
     else
-      boot.reason = isLast && signs.watchdogFired ? "watchdog" : "unclean";
+      boot.reason = orderly.reason.empty() ? "unclean" : orderly.reason;
   }
   return result;
 }

@@ -79,6 +79,27 @@ TEST_F(BootsSource, FindsThePanicOfTheRunInWhichItsDumpWasWritten) {
   EXPECT_EQ(reasons(), (Reasons{"unclean", "panic", "reboot"})) << "older than all";
 }
 
+TEST_F(BootsSource, TellsAPanicOnTheWayToAnOrderlyEnd) {
+  run(kFirst, {reached("shutdown.target"), reached("reboot.target"), kernel("Kernel panic - not syncing")});
+  run(kSecond, {reached("reboot.target")});
+  const uint64_t end = journal_.nextTime();
+  journal_.setNextTime(end + 60'000'000);
+  run(kThird, {reached("poweroff.target")});
+  run(kCurrent);
+  EXPECT_EQ(reasons(), (Reasons{"panic", "reboot", "power-off"}));
+  dump("sys/fs/pstore/dmesg-efi_pstore-1", "Panic#1 Part1\n", end + 30'000'000);
+  EXPECT_EQ(reasons(), (Reasons{"panic", "panic", "power-off"}));
+  dump("sys/fs/pstore/dmesg-ramoops-0", "Panic#1 Part1\n", 0);
+  EXPECT_EQ(reasons(), (Reasons{"panic", "panic", "panic"}));
+}
+
+TEST_F(BootsSource, TellsAHangOnTheWayToAnOrderlyEndThatAWatchdogEnded) {
+  run(kFirst, {reached("reboot.target")});
+  run(kSecond, {reached("shutdown.target"), reached("reboot.target")});
+  run(kCurrent);
+  EXPECT_EQ(reasons(true), (Reasons{"reboot", "watchdog"}));
+}
+
 TEST_F(BootsSource, TakesADumpWithoutATimeForTheLastRuns) {
   run(kFirst);
   run(kSecond);
