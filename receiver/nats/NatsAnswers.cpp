@@ -41,19 +41,13 @@ void NatsLog::takeStreamNames(std::string_view json) {
   // A stream of that name, or several, each for some partitions, whose names begin with it.
   if (json.find("[\"" + settings_.stream) != std::string_view::npos) {
     isMissingTold_ = false;
+    mustAskRetention_ = true;
     hasStream_ = true;
-    askForRetention(memberOf(json, "\"streams\":["));
     return setUp(true);
   }
   if (!isMissingTold_.exchange(true))
     lines_.error("log: no stream \"%s\" takes \"kyt.events.0\"; kytreceiver --make-streams makes it",
                  settings_.stream.c_str());
-}
-
-void NatsLog::askForRetention(std::string_view stream) {
-  static_cast<void>(natsConnection_PublishRequest(connection_.get(),
-                                                  ("$JS.API.STREAM.INFO." + std::string(stream)).c_str(),
-                                                  (inbox_ + "info").c_str(), "", 0));
 }
 
 // One that was made by hand, by other settings or by an earlier version: what differs of it is told, and stays.

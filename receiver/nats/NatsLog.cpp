@@ -128,8 +128,13 @@ void NatsLog::run() {
     if (!isStopping_) changed_.waitUntil(mutex_, std::chrono::steady_clock::now() + kAskAgain);
   }
   while (!isStopping()) {
-    if (isConnected_ && !hasStream_ && !isTooSmall_) askForStream();
+    // Which stream takes the events' subject: none as long as nobody has made it, or it has no leader.
+    if (isConnected_ && !hasStream_ && !isTooSmall_)
+      ask("$JS.API.STREAM.NAMES", "names", R"({"subject":")" + eventSubject("0") + R"("})");
     for (const Item& item : takeItems()) write(item);
+    // Posts go first.
+    if (hasStream_ && mustAskRetention_.exchange(false))
+      ask("$JS.API.STREAM.INFO." + settings_.stream, "info", "");
   }
 }
 
@@ -241,11 +246,9 @@ void NatsLog::setUp(bool isUp) {
   if (!isEnding_ && std::exchange(isUp_, isUp) != isUp) listener_->logIsUp(isUp);
 }
 
-// Which stream takes the events' subject: none as long as nobody has made it, or it has no leader.
-void NatsLog::askForStream() {
-  const std::string request = R"({"subject":")" + eventSubject("0") + R"("})";
-  static_cast<void>(natsConnection_PublishRequest(connection_.get(), "$JS.API.STREAM.NAMES",
-                                                  (inbox_ + "names").c_str(), request.data(),
+void NatsLog::ask(const std::string& subject, const char* reply, const std::string& request) {
+  static_cast<void>(natsConnection_PublishRequest(connection_.get(), subject.c_str(),
+                                                  (inbox_ + reply).c_str(), request.data(),
                                                   static_cast<int>(request.size())));
 }
 

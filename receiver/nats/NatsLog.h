@@ -78,9 +78,8 @@ class NatsLog final : public EventLog {
   [[nodiscard]] bool isStopping() EXCLUDES(mutex_);
   void write(const Item& item);
   [[nodiscard]] natsStatus publish(const Item& item);
-  void askForStream();
+  void ask(const std::string& subject, const char* reply, const std::string& request);
   void takeStreamNames(std::string_view json);
-  void askForRetention(std::string_view stream);
   void takeStreamInfo(std::string_view json);
   void takeAcknowledgement(uint64_t token, natsMsg* message);
   void endDeadLetter(bool isStored);
@@ -96,7 +95,8 @@ class NatsLog final : public EventLog {
   std::atomic<uint64_t> deadInFlight_{0};  // dead letters without an answer
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
-  std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false}, isTooSmall_{false};
+  std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false}, mustAskRetention_{false},
+      isTooSmall_{false};
   std::thread thread_;
 
   Mutex upMutex_;  // held while the listener is told, so that it is told in order
