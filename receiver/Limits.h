@@ -47,6 +47,8 @@ struct Limits {
   // Seconds for the log to acknowledge: with spoolTime after it a post is answered before its front gives it up, which is
   // after 10 where docs/FLEET.md is followed.
   static constexpr double maxPublishSeconds = 4;
+  // Between attempts to open the spool of a disk that is broken.
+  static constexpr std::chrono::seconds reopenPause{5};
   // Bytes of a header that a message carries on; what is longer is cut.
   static constexpr size_t maxFactBytes = 256;
   // Where posts are opened: bytes after decompression, which are so many times those before, but so many at least and at

@@ -75,23 +75,33 @@ class Ticker {
 };
 
 // The spool's folder for this process alone, until it ends.
-Descriptor lockFolder(const std::string& folder, Log& lines) {
-  if (const auto wrong = makeFolders(folder, 0700)) {
-    lines.error("spool: %s", wrong->c_str());
-    return {};
+class SpoolFolder {
+ public:
+  explicit SpoolFolder(const std::string& folder) : folder_(folder) {}
+
+  // What keeps it from being ours, or none. May be tried again.
+  std::optional<std::string> take() {
+    isTaken_ = false;
+    if (lock_.get() >= 0) return std::nullopt;
+    if (auto wrong = makeFolders(folder_, 0700)) return wrong;
+    const std::string file = folder_ + "/lock";
+    Descriptor lock = ownDescriptor(::open(file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
+    if (lock.get() < 0) return file + ": " + errorText(errno);
+    if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
+      isTaken_ = true;
+      return "another receiver has the folder " + folder_;
+    }
+    lock_ = std::move(lock);
+    return std::nullopt;
   }
-  const std::string file = folder + "/lock";
-  Descriptor lock = ownDescriptor(::open(file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
-  if (lock.get() < 0) {
-    lines.error("spool: %s: %s", file.c_str(), errorText(errno).c_str());
-    return {};
-  }
-  if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
-    lines.error("spool: another receiver has the folder %s", folder.c_str());
-    return {};
-  }
-  return lock;
-}
+  // Two would answer for each other's posts.
+  [[nodiscard]] bool isTaken() const { return isTaken_; }
+
+ private:
+  const std::string& folder_;
+  Descriptor lock_;
+  bool isTaken_ = false;
+};
 
 // The identity for HTTPS. False: it cannot be read, which was said.
 bool readIdentity(const Settings& settings, std::optional<http::Identity>& identity, Log& lines) {
@@ -162,13 +172,15 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
                 Log& lines) {
   std::optional<http::Identity> identity;
   if (!readIdentity(settings, identity, lines)) return 1;
-  const Descriptor folder = lockFolder(settings.spoolPath, lines);
-  if (folder.get() < 0) return 1;
+  SpoolFolder folder(settings.spoolPath);
+  if (const auto wrong = folder.take(); wrong && folder.isTaken())
+    return lines.error("spool: %s", wrong->c_str()), 1;
   const LinuxClock clock;
   Figures figures;
   SQLitePostStore store(settings.spoolPath, "libsqlite3.so.0", SQLitePostStore::Aside::each);
-  Spool spool(store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions);
-  if (const auto wrong = spool.open()) return lines.error("spool: %s", wrong->c_str()), 1;
+  Spool spool(store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions,
+              [&folder] { return folder.take(); });
+  spool.open();
   Delivery delivery(log, spool, clock, figures, lines, settings.log.publishTime);
   DeadLetters deadLetters(log, clock, figures);
   PostHandler handler(settings, options.posts, delivery, log, deadLetters, clock, figures);

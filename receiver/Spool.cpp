@@ -18,13 +18,14 @@ uint64_t bytesOf(const LogMessage& message) {
 }  // namespace
 
 Spool::Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
-             uint32_t partitions)
+             uint32_t partitions, std::function<std::optional<std::string>()> prepare)
     : store_(store),
       maxBytes_(maxBytes),
       clock_(clock),
       figures_(figures),
       lines_(lines),
-      lanes_(partitions) {}
+      lanes_(partitions),
+      prepare_(std::move(prepare)) {}
 
 Spool::~Spool() {
   stop();
@@ -140,6 +141,7 @@ void Spool::showFigures() {
 }
 
 std::optional<MonotonicTime> Spool::turn(Replays& replays) {
+  if (!isOpen_ && clock_.monotonic() >= nextOpening_) open();
   takeReplies();
   const Additions added = takeAdditions();
   const bool hadEntries = !entries_.empty();

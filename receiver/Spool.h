@@ -44,14 +44,16 @@ class Replays {
 class Spool {
  public:
   // All outlive this. `partitions`: of the log, 1 at least.
+  // `prepare` is called before the store is opened: what keeps it from that, or none.
   Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
-        uint32_t partitions = 1);
+        uint32_t partitions = 1, std::function<std::optional<std::string>()> prepare = {});
   ~Spool();  // stop()
   Spool(const Spool&) = delete;
   Spool& operator=(const Spool&) = delete;
 
-  // Finds what an earlier process left. What is wrong, or none. Before all else.
-  [[nodiscard]] std::optional<std::string> open();
+  // Finds what an earlier process left. Before all else. Where the disk does not give it, that is said, the spool is broken, and
+  // the thread tries again (Limits::reopenPause).
+  void open();
   // `replays` outlives stop().
   void start(Replays& replays);
   // What was added is kept first.
@@ -77,7 +79,9 @@ class Spool {
   [[nodiscard]] bool hasReplays(uint32_t partition) const { return lanes_.at(partition).isReplayable.load(); }
   [[nodiscard]] uint32_t partitions() const { return static_cast<uint32_t>(lanes_.size()); }
   [[nodiscard]] uint64_t damagedFiles() const { return store_.filesAside(); }  // that lie beside it
-  [[nodiscard]] bool isBroken() const { return isBroken_.load(); }             // the last change failed
+  [[nodiscard]] bool isBroken() const {
+    return isBroken_.load();
+  }  // the last change failed, or it is not open
 
  private:
   struct Adding {
@@ -110,6 +114,7 @@ class Spool {
   void run(Replays& replays) EXCLUDES(mutex_);
   [[nodiscard]] Additions takeAdditions() EXCLUDES(mutex_);
   void takeReplies() EXCLUDES(mutex_);
+  [[nodiscard]] std::optional<std::string> problemOfOpening();
   [[nodiscard]] bool change(const Additions& added);
   void forget(const std::vector<int64_t>& removed);
   void tell(const Additions& added, SpoolVerdict verdict) EXCLUDES(mutex_);
@@ -136,7 +141,11 @@ class Spool {
 
   std::vector<Lane> lanes_;  // by partition
 
+  const std::function<std::optional<std::string>()> prepare_;
+
   // The spool's thread alone.
+  bool isOpen_ = false;
+  MonotonicTime nextOpening_{};
   std::map<int64_t, Entry> entries_;          // but for those that are stuck
   uint64_t stuckPosts_ = 0, stuckBytes_ = 0;  // that the log never takes, or the disk does not give
   int64_t lastNumber_ = 0;

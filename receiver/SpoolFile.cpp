@@ -2,6 +2,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "receiver/Limits.h"
 #include "receiver/Spool.h"
 
 namespace kyt::receiver {
@@ -19,7 +20,27 @@ StoredPost storedPostOf(const LogMessage& message, int64_t number, int64_t now) 
 
 }  // namespace
 
-std::optional<std::string> Spool::open() {
+void Spool::open() {
+  const auto wrong = problemOfOpening();
+  isOpen_ = !wrong;
+  if (wrong) {
+    forgetAll();
+    count(figures_.spoolFailures);
+    nextOpening_ = clock_.monotonic() + Limits::reopenPause;
+    if (!isBroken_.exchange(true))
+      lines_.error("spool: %s; posts that the log does not take are refused", wrong->c_str());
+    return showFigures();
+  }
+  if (isBroken_.exchange(false)) lines_.normal("spool: it can be written to again");
+  if (!entries_.empty())
+    lines_.normal("spool: %zu posts of %llu bytes are left from before", entries_.size(),
+                  static_cast<unsigned long long>(bytes_.load()));
+  showFigures();
+}
+
+std::optional<std::string> Spool::problemOfOpening() {
+  if (prepare_)
+    if (auto wrong = prepare_()) return wrong;
   for (bool again : {true, false}) {
     const auto wrong = store_.open([this](StoredPostHead head) {
       if (head.isUnreadable) return count(figures_.stuck);
@@ -31,10 +52,6 @@ std::optional<std::string> Spool::open() {
     if (wrong->kind != PostStoreProblem::Kind::damaged || !again) return wrong->text;
     setAside(wrong->text);
   }
-  if (!entries_.empty())
-    lines_.normal("spool: %zu posts of %llu bytes are left from before", entries_.size(),
-                  static_cast<unsigned long long>(bytes_.load()));
-  showFigures();
   return std::nullopt;
 }
 
@@ -76,6 +93,7 @@ void Spool::forgetAll() {
 
 // One change of the file: what was added, what the log has. False: nothing of it was done.
 bool Spool::change(const Additions& added) {
+  if (!isOpen_) return added.empty();
   if (added.empty() && toRemove_.empty()) return true;
   const int64_t now = clock_.timeOfDay().seconds;
   std::vector<StoredPost> posts;

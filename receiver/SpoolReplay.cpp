@@ -98,6 +98,7 @@ void Spool::replayMore(Replays& replays, MonotonicTime now) {
 std::optional<MonotonicTime> Spool::nextTurn(MonotonicTime now, bool takesReplays) const {
   std::optional<MonotonicTime> due;
   if (!toRemove_.empty()) due = now + Limits::replayPause;
+  if (!isOpen_) due = nextOpening_;
   if (!takesReplays) return due;
   for (const Lane& lane : lanes_)
     if (!lane.waiting.empty() && lane.inFlight < lane.window && now < lane.nextReplay)

@@ -26,7 +26,7 @@ class DeliveryTest : public ::testing::Test {
  protected:
   explicit DeliveryTest(uint64_t maxBytes = 10000, uint32_t partitions = 1)
       : spool_(store_, maxBytes, clock_, figures_, lines_, partitions) {
-    EXPECT_FALSE(spool_.open());
+    spool_.open();
     log_.start(delivery_);
     delivery_.logIsUp(true);
   }
@@ -196,7 +196,7 @@ TEST_F(DeliveryTest, WhatAnEarlierProcessLeftIsReplayed) {
   Figures figures;
   FakePostStore store(disk_);
   Spool spool(store, 10000, clock_, figures, lines_);
-  EXPECT_FALSE(spool.open());
+  spool.open();
   EXPECT_EQ(spool.posts(), 2U);
   FakeLog log;
   Delivery delivery(log, spool, clock_, figures, lines_, std::chrono::seconds(2));
@@ -205,6 +205,35 @@ TEST_F(DeliveryTest, WhatAnEarlierProcessLeftIsReplayed) {
   for (int i = 0; i < 3; ++i) spool.turn(delivery);
   EXPECT_EQ(log.stored(), (std::map<std::string, int>{{"a", 1}, {"b", 1}}));
   EXPECT_EQ(spool.posts(), 0U);
+}
+
+TEST_F(DeliveryTest, ASpoolThatTheDiskDoesNotGiveIsOpenedLaterAndNothingIsWrittenBefore) {
+  log_.setMood(Mood::refuses);
+  static_cast<void>(take("a"));
+  turn();
+  Figures figures;
+  FakePostStore store(disk_);
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read-only"};
+  Spool spool(store, 10000, clock_, figures, lines_);
+  spool.open();
+  EXPECT_TRUE(spool.isBroken());
+  EXPECT_TRUE(sink_.contains("read-only"));
+  std::optional<SpoolVerdict> verdict;
+  const auto add = [&] {
+    verdict.reset();
+    spool.add(message("b"), [&](SpoolVerdict is) { verdict = is; });
+    spool.turn(delivery_);
+  };
+  disk_->problem.reset();
+  add();
+  EXPECT_EQ(verdict, SpoolVerdict::broken) << "it would take the number of one that is there";
+  clock_.advance(Limits::reopenPause);
+  add();
+  EXPECT_EQ(verdict, SpoolVerdict::kept);
+  EXPECT_FALSE(spool.isBroken());
+  ASSERT_EQ(disk_->posts.size(), 2U);
+  EXPECT_EQ(disk_->posts.begin()->second.url, "a");
+  EXPECT_EQ(spool.posts(), 2U);
 }
 
 TEST_F(DeliveryTest, ADamagedSpoolIsSetAsideAndBegunAnew) {
@@ -397,7 +426,7 @@ TEST_F(DeliveryTest, APostThatTheLogNeverTookIsTriedAgainAtTheNextStart) {
   Figures figures;
   FakePostStore store(disk_);
   Spool spool(store, 10000, clock_, figures, lines_);
-  EXPECT_FALSE(spool.open());
+  spool.open();
   FakeLog log;
   Delivery delivery(log, spool, clock_, figures, lines_, std::chrono::seconds(2));
   log.start(delivery);

@@ -4,6 +4,7 @@
 #include <algorithm>
 #include <atomic>
 #include <cstdio>
+#include <filesystem>
 #include <fstream>
 #include <map>
 #include <memory>
@@ -374,6 +375,26 @@ TEST_F(ReceiverInTrouble, WithTheSpoolsDiskFullItRefusesWith429AndGoesOnWhenTheL
   EXPECT_TRUE(eventually([&] { return receiver_->post(postText(1000)).status == 200; }));
   EXPECT_TRUE(spoolBecomesEmpty()) << receiver_->output();
   EXPECT_EQ(view_->messages(), static_cast<uint64_t>(taken) + 1);
+}
+
+TEST_F(ReceiverInTrouble, WithoutASpoolItStartsAndServesAndTakesItUpWhenTheDiskGivesIt) {
+  const TemporaryFolder folder;
+  const std::string inTheWay = folder.write("spool", "no folder");
+  ReceiverProcess::Options options;
+  options.spool = inTheWay;
+  start(options);
+  EXPECT_NE(receiver_->output().find("posts that the log does not take are refused"), std::string::npos)
+      << receiver_->output();
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(receiver_->get("/readyz").status, 200);
+  servers_.kill(0);
+  ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_log_up") == 0; }));
+  EXPECT_EQ(receiver_->post(postText(2)).status, 429);
+  EXPECT_EQ(receiver_->get("/readyz").status, 503);
+  std::filesystem::remove(inTheWay);
+  EXPECT_TRUE(eventually([&] { return receiver_->post(postText(3)).status == 200; })) << receiver_->output();
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
+  EXPECT_EQ(receiver_->get("/readyz").status, 200);
 }
 
 TEST_F(ReceiverInTrouble, WithTheBrakeOnItRefusesWith503) {
