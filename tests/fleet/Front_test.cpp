@@ -64,9 +64,9 @@ class FrontTest : public ::testing::Test {
     options_.site = folder_.write("changed-site", site.replace(at, what.size(), by));
   }
   // A client that sends a post's headers and half its body, and then waits for the connection's end.
-  [[nodiscard]] tools::ChildProcess startHalfAPost() const {
+  [[nodiscard]] tools::ChildProcess startHalfAPost() {
     tools::ChildProcess::Options how;
-    how.inputFile = folder_.write("half",
+    how.inputFile = folder_.write("half-" + std::to_string(++halfPosts_),
                                   "POST /v1/events HTTP/1.1\r\nHost: events.example.org\r\n"
                                   "Content-Length: 1000\r\n\r\n" +
                                       std::string(500, 'x'));
@@ -88,6 +88,7 @@ class FrontTest : public ::testing::Test {
   TemporaryFolder folder_;
   tools::FrontOptions options_;
   std::optional<tools::Front> front_;
+  int halfPosts_ = 0;
 };
 
 TEST_F(FrontTest, IsGoodInTheEyesOfNginx) {
