@@ -136,6 +136,33 @@ kill $daemon; wait $daemon; grep -c '"event":"message"' told
   EXPECT_TRUE(run.text.ends_with("1\n")) << run.text;
 }
 
+// The listeners get no end of the pipe: it would stay open for the sender.
+TEST(SendFromStandardInput, EndsWithAnErrorWhereEventsWereLostWithTheirDaemon) {
+  const TemporaryFolder folder;
+  const ProgramRun run =
+      shell(folder.path(), R"(kytctl listen --socket "$PWD/s" --die-after 2 > told & first=$!
+until [ -S s ]; do sleep 0.01; done
+mkfifo lines
+kytctl send --socket "$PWD/s" --client-type 20 --stdin --timeout 60 < lines > sent 2>&1 & sender=$!
+exec 7> lines
+printf '{"category":1,"type":1}\n{"category":1,"type":2}\n' >&7
+wait $first
+kytctl listen --socket "$PWD/s" > again 7>&- & second=$!
+until grep -q listening again; do sleep 0.01; done
+echo '{"category":1,"type":3}' >&7
+exec 7>&-
+wait $sender || echo "status $?"
+kill $second; wait $second; grep -c '"type":3' again; cat sent
+)");
+  EXPECT_TRUE(run.text.starts_with("status 1\n1\n")) << run.text;
+  std::smatch lost;
+  ASSERT_TRUE(std::regex_search(run.text, lost, std::regex("sent (\\d), lost (\\d), dropped 0\n")))
+      << run.text;
+  EXPECT_EQ(std::stoi(lost[1]) + std::stoi(lost[2]), 3);
+  EXPECT_NE(run.text.find("kytctl: " + lost[2].str() + " events may not have arrived\n"), std::string::npos)
+      << run.text;
+}
+
 TEST(SendWithoutADaemon, IsQuietWhereItIsToBe) {
   const TemporaryFolder folder;
   const std::string line = "kytctl send --socket \"$PWD/none\" --client-type 20 --category 1 --type 1";
@@ -143,6 +170,33 @@ TEST(SendWithoutADaemon, IsQuietWhereItIsToBe) {
   const ProgramRun quiet = shell(folder.path(), line + " --quiet-if-no-daemon");
   EXPECT_EQ(quiet.status, 0);
   EXPECT_EQ(quiet.text, "");
+}
+
+TEST(SendWithoutADaemon, ReadsWhatItIsGivenSoThatTheProducerLives) {
+  const TemporaryFolder folder;
+  // More than a pipe holds.
+  const ProgramRun run = shell(folder.path(), R"({ head -c 1000000 /dev/zero && echo lives > producer; } |
+  kytctl send --socket "$PWD/none" --client-type 20 --stdin --quiet-if-no-daemon
+cat producer
+)");
+  EXPECT_EQ(run.text, "lives\n");
+  EXPECT_EQ(run.status, 0);
+}
+
+TEST(SendWithoutADaemon, IsNotQuietAboutAWrongInstallation) {
+  const TemporaryFolder folder;
+  const auto send = [&](const std::string& socket) {
+    return shell(folder.path(),
+                 "kytctl send --socket \"" + socket +
+                     "\" --client-type 20 --category 1 --type 1 --timeout 1 --quiet-if-no-daemon");
+  };
+  folder.write("file", "");
+  const ProgramRun noFolder = send("$PWD/file/socket");
+  EXPECT_EQ(noFolder.status, 1);
+  EXPECT_NE(noFolder.text.find("/file/socket: Not a directory\n"), std::string::npos) << noFolder.text;
+  const ProgramRun tooLong = send("$PWD/" + std::string(200, 'x'));
+  EXPECT_EQ(tooLong.status, 1);
+  EXPECT_NE(tooLong.text.find("File name too long\n"), std::string::npos) << tooLong.text;
 }
 
 class PythonOnAStage : public StageTest {

@@ -18,6 +18,20 @@ namespace {
 
 constexpr char kSocketPath[] = "/run/kytreportingd/com.vantu.kytreportingd";
 
+// Why nobody takes a connection there now, or 0.
+int connectError(const std::string& path) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (path.size() >= sizeof address.sun_path) return ENAMETOOLONG;
+  std::memcpy(address.sun_path, path.data(), path.size());
+  const int tried = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  if (tried < 0) return 0;
+  const bool taken = ::connect(tried, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+  const int why = errno;
+  ::close(tried);
+  return taken || why == EAGAIN ? 0 : why;  // EAGAIN: a daemon that has no time
+}
+
 }  // namespace
 
 void Answer::set(std::string text, std::optional<Error> error) {
@@ -64,18 +78,14 @@ std::string socketPath(const ConnectionOptions& connection) {
 
 std::optional<std::string> noDaemon(const ConnectionOptions& connection) {
   const std::string path = socketPath(connection);
-  const std::string text = "no daemon listens at " + path + ": ";
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) return text + std::strerror(ENAMETOOLONG);
-  std::memcpy(address.sun_path, path.data(), path.size());
-  const int tried = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  if (tried < 0) return std::nullopt;
-  const bool taken = ::connect(tried, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
-  const int why = errno;
-  ::close(tried);
-  if (taken || why == EAGAIN) return std::nullopt;  // EAGAIN: a daemon that has no time
-  return text + std::strerror(why);
+  const int why = connectError(path);
+  if (why == 0) return std::nullopt;
+  return "no daemon listens at " + path + ": " + std::strerror(why);
+}
+
+bool nobodyListens(const ConnectionOptions& connection) {
+  const int why = connectError(socketPath(connection));
+  return why == ENOENT || why == ECONNREFUSED;
 }
 
 int failedCall(const ConnectionOptions& connection, const std::string& what, const std::string& text) {

@@ -54,6 +54,10 @@ class Refusal {
 // "no daemon listens at PATH: REASON" when nobody takes a connection there now, or none.
 [[nodiscard]] std::optional<std::string> noDaemon(const ConnectionOptions& connection);
 
+// Whether nobody could listen there: the socket or its folder is missing, or nobody has it open. What stands in the way
+// otherwise (a folder that may not be entered, a path that is too long) is a wrong installation.
+[[nodiscard]] bool nobodyListens(const ConnectionOptions& connection);
+
 // Says that `what` failed, and why; returns 1. The text stands unless nobody listens.
 int failedCall(const ConnectionOptions& connection, const std::string& what, const std::string& text);
 

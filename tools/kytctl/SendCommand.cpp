@@ -2,6 +2,7 @@
 #include <chrono>
 #include <cstdio>
 #include <iostream>
+#include <limits>
 #include <memory>
 #include <variant>
 
@@ -86,13 +87,20 @@ int sendLines(const ConnectionOptions& connection, const KYTReporting::Options& 
   }
   // What stood before a line that is wrong was asked for too.
   const int finished = script.run({{"do", "finish"}});
-  return status != 0 ? status : finished;
+  if (status != 0 || finished != 0) return status != 0 ? status : finished;
+  if (const uint64_t missing = script.missing(); missing > 0)
+    return failed(std::to_string(missing) + " events may not have arrived");
+  return 0;
 }
 
 }  // namespace
 
 int sendCommand(const ConnectionOptions& connection, const SendOptions& given) {
-  if (given.quietIfNoDaemon && noDaemon(connection)) return 0;
+  if (given.quietIfNoDaemon && nobodyListens(connection)) {
+    // Read all the same: a producer that writes into a closed pipe would be killed.
+    if (given.fromStandardInput) std::cin.ignore(std::numeric_limits<std::streamsize>::max());
+    return 0;
+  }
   KYTReporting::Options options;
   options.socketPath = socketPath(connection);
   options.sessionInfo = sessionInfoOf(given);

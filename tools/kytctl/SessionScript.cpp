@@ -246,10 +246,12 @@ int SessionScript::finish(const Dictionary&) {
   const bool done = session_->finish(timeout);
   unfinished_ = false;
   const KYTReporting::Statistics figures = session_->statistics();
+  const uint64_t lost = figures.lostOnConnectionEnd + figures.lostInQueue;
+  const uint64_t dropped =
+      figures.droppedQueueFull + figures.droppedInvalid + figures.droppedUnsendable + figures.droppedTooLate;
+  missing_ = lost + dropped;
   std::printf("sent %llu, lost %llu, dropped %llu\n", static_cast<unsigned long long>(figures.sent),
-              static_cast<unsigned long long>(figures.lostOnConnectionEnd + figures.lostInQueue),
-              static_cast<unsigned long long>(figures.droppedQueueFull + figures.droppedInvalid +
-                                              figures.droppedUnsendable + figures.droppedTooLate));
+              static_cast<unsigned long long>(lost), static_cast<unsigned long long>(dropped));
   const char* const late = "the daemon did not take everything in time";
   return done ? 0 : failedCall(connection_, "finish", refusal_->why().value_or(late));
 }

@@ -22,6 +22,8 @@ class SessionScript {
   [[nodiscard]] int run(const Dictionary& step);
   // No more steps. Says so, where messages were sent and neither "finish" nor an answer came after them.
   void end() const;
+  // After "finish": messages that were lost or dropped. Of the lost the daemon may have taken some.
+  [[nodiscard]] uint64_t missing() const { return missing_; }
 
  private:
   class Aggregated;
@@ -52,6 +54,7 @@ class SessionScript {
   std::shared_ptr<Refusal> refusal_;              // of the session; likewise
   bool configured_ = false;                       // what is sent before is dropped by the daemon
   bool unfinished_ = false;                       // the daemon may not have taken what was sent
+  uint64_t missing_ = 0;
   std::unique_ptr<KYTReporting> session_;
 };
 
