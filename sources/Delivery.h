@@ -17,8 +17,8 @@ namespace kyt::sources {
 // What became of a report.
 struct Handover {
   bool offered = false;  // false: the daemon was given nothing of it
-  std::vector<bool>
-      taken;  // of each event, whether the daemon says so; one that was offered and is not may be
+  // Of each event whether the daemon says that it has it. One that was offered, and is not taken, it may have as well.
+  std::vector<bool> taken;
   [[nodiscard]] bool isWhole() const;
 };
 
@@ -28,8 +28,8 @@ class Delivery {
     std::string socket;  // empty: as the client library finds it
     std::string client;  // "ClientName", the program's own name
     uint8_t clientType = 0;
-    std::chrono::milliseconds patience =
-        std::chrono::seconds(30);  // for all of one report, the goodbye included
+    // For all of one report, the goodbye included.
+    std::chrono::milliseconds patience = std::chrono::seconds(30);
   };
   explicit Delivery(Options options) : options_(std::move(options)) {}
   // What the daemon does with what it has taken (the owner's consent, filters, the network) is its own, and in its books.

@@ -1,4 +1,5 @@
 // kytsource-resources in front of a real daemon and a server.
+#include "kytreporting/FakeDaemon.h"
 #include "tests/sources/EventsFile.h"
 #include "tests/sources/SourceFixture.h"
 
@@ -43,6 +44,33 @@ TEST_F(ResourcesSource, ReportsOneEventForAPeriodWithTheFieldsThatItsEventsFileN
   EXPECT_GE(numbers.size(), 3U);
   EXPECT_EQ(*numbers.rbegin() - *numbers.begin() + 1, static_cast<int>(numbers.size())) << "without a gap";
   EXPECT_EQ(*numbers.begin() % 86400, 0) << "the day's";
+}
+
+TEST_F(ResourcesSource, TriesAReportAgainAsItWasThatADaemonGotAndDidNotAnswer) {
+  const auto messages = [](const testing::FakeDaemon& daemon) {
+    return daemon.events(testing::Kind::message);
+  };
+  const auto listen = [this](uint64_t dieAfter) {
+    testing::FakeDaemon::Options options;
+    options.socketPath = folder_ / "socket";
+    options.dieAfter = dieAfter;
+    auto made = std::make_unique<testing::FakeDaemon>(std::move(options));
+    EXPECT_EQ(made->start(), std::nullopt);
+    return made;
+  };
+  auto daemon = listen(1);
+  start(folder_ / "socket", "5");
+  ASSERT_TRUE(tools::waitUntil(std::chrono::seconds(60), [&] { return messages(*daemon).size() == 1; }))
+      << folder_.read("output");
+  const auto first = messages(*daemon).front().payload;
+  daemon.reset();
+  daemon = listen(0);
+  ASSERT_TRUE(tools::waitUntil(std::chrono::seconds(60), [&] { return messages(*daemon).size() >= 2; }))
+      << folder_.read("output");
+  program_->signal(SIGTERM);
+  EXPECT_EQ(program_->wait(std::chrono::seconds(60)), 0);
+  EXPECT_EQ(messages(*daemon)[0].payload, first);
+  EXPECT_EQ(messages(*daemon)[1].payload.integer("report"), first.integer("report") + 1);
 }
 
 TEST_F(ResourcesSource, GoesOnSummingUpWhereThereIsNoDaemon) {
