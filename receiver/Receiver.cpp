@@ -1,7 +1,6 @@
 #include "receiver/Receiver.h"
 
 #include <fcntl.h>
-#include <sys/file.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -27,6 +26,7 @@
 #include "receiver/Limits.h"
 #include "receiver/Metrics.h"
 #include "receiver/Spool.h"
+#include "receiver/SpoolFolder.h"
 
 namespace kyt::receiver {
 namespace {
@@ -72,35 +72,6 @@ class Ticker {
   ConditionVariable changed_;
   bool isStopping_ GUARDED_BY(mutex_) = false;
   std::thread thread_;
-};
-
-// The spool's folder for this process alone, until it ends.
-class SpoolFolder {
- public:
-  explicit SpoolFolder(const std::string& folder) : folder_(folder) {}
-
-  // What keeps it from being ours, or none. May be tried again.
-  std::optional<std::string> take() {
-    isTaken_ = false;
-    if (lock_.get() >= 0) return std::nullopt;
-    if (auto wrong = makeFolders(folder_, 0700)) return wrong;
-    const std::string file = folder_ + "/lock";
-    Descriptor lock = ownDescriptor(::open(file.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
-    if (lock.get() < 0) return file + ": " + errorText(errno);
-    if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
-      isTaken_ = true;
-      return "another receiver has the folder " + folder_;
-    }
-    lock_ = std::move(lock);
-    return std::nullopt;
-  }
-  // Two would answer for each other's posts.
-  [[nodiscard]] bool isTaken() const { return isTaken_; }
-
- private:
-  const std::string& folder_;
-  Descriptor lock_;
-  bool isTaken_ = false;
 };
 
 // The identity for HTTPS. False: it cannot be read, which was said.

@@ -5,15 +5,18 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <memory>
 #include <string>
 #include <variant>
+#include <vector>
 
 #include "platform/base/Counters.h"
 #include "platform/linux/base/StopSignals.h"
 #include "platform/linux/cli/CommandLine.h"
 #include "platform/linux/service/LogSinks.h"
 #include "receiver/Receiver.h"
+#include "receiver/SpoolContents.h"
 #include "receiver/kafka/KafkaLog.h"
 #include "receiver/nats/NatsLog.h"
 
@@ -26,7 +29,8 @@ struct Arguments {
   std::string readyFile;
   std::string check = "headers";
   int refuseWith = 429;
-  bool checkConfig = false, makeStreams = false, updateStreams = false;
+  bool checkConfig = false, makeStreams = false, updateStreams = false, listSpool = false;
+  int removeFromSpool = 0;
 };
 
 void raiseDescriptorLimit() {
@@ -58,6 +62,23 @@ int makeStreams(const Settings& settings, bool updates, Log& lines) {
         "log.max_age_seconds then leaves at once");
   std::printf("The streams \"%s\" and \"kyt-dead-letters\" are there, as the settings say.\n",
               settings.log.stream.c_str());
+  return 0;
+}
+
+int listSpool(const Settings& settings) {
+  const auto found = postsOfSpool(settings);
+  if (const auto* wrong = std::get_if<std::string>(&found)) return fail(*wrong);
+  for (const SpooledPost& post : std::get<std::vector<SpooledPost>>(found)) {
+    const std::time_t keptAt = post.keptAt;
+    std::tm utc{};
+    char time[32] = "";
+    std::strftime(time, sizeof time, "%Y-%m-%dT%H:%M:%SZ", ::gmtime_r(&keptAt, &utc));
+    if (post.id.empty())
+      std::printf("%lld the disk does not give it\n", static_cast<long long>(post.number));
+    else
+      std::printf("%lld %s %s %llu bytes %s\n", static_cast<long long>(post.number), post.id.c_str(), time,
+                  static_cast<unsigned long long>(post.bytes), post.sender.c_str());
+  }
   return 0;
 }
 
@@ -102,6 +123,12 @@ int main(int argc, char** argv) {
                    "Make the streams that are missing in the log, say what differs of the others, and end");
   commandLine.flag("--update-streams", arguments.updateStreams,
                    "The same, but change the others too: what is too old leaves at once");
+  commandLine.flag("--list-spool", arguments.listSpool,
+                   "Print the posts of the spool, a line each, and end; no receiver may have it");
+  commandLine
+      .option("--remove-from-spool", arguments.removeFromSpool,
+              "Remove the post with that number from the spool for good, and end")
+      .between(1, 2147483647);
   commandLine
       .option("--check", arguments.check,
               "What is looked at of each post; full: it is opened, and its JSON must be good")
@@ -128,5 +155,10 @@ int main(int argc, char** argv) {
     return 1;
   }
   if (arguments.checkConfig) return 0;
+  if (arguments.listSpool) return listSpool(std::get<Settings>(settings));
+  if (arguments.removeFromSpool != 0) {
+    const auto wrong = removeFromSpool(std::get<Settings>(settings), arguments.removeFromSpool);
+    return wrong ? fail(*wrong) : 0;
+  }
   return run(std::get<Settings>(settings), arguments);
 }

@@ -1,12 +1,15 @@
-// A spool's file that can no longer be read.
+// The spool in the hands of people: its file damaged, its posts listed.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+#include <regex>
 #include <string>
+#include <vector>
 
 #include "tests/receiver/ReceiverTest.h"
+#include "tests/support/Programs.h"
 
 namespace kyt::receiver {
 namespace {
@@ -65,6 +68,36 @@ TEST_F(ReceiverWithADamagedSpool, SaysSoAndOverwritesNothingAndItsPostsCanBeHadA
   EXPECT_EQ(second.metric("kyt_spool_replayed_total"), 5);
   view_.emplace(servers_.url(0));
   EXPECT_EQ(view_->messages(), 5U);
+}
+
+class SpoolForPeople : public ReceiverTest {
+ protected:
+  [[nodiscard]] ProgramRun run(std::vector<std::string> arguments) const {
+    arguments.insert(arguments.begin(), {"--config", receiver_->configFile()});
+    return runProgram(KYT_RECEIVER, arguments);
+  }
+};
+
+TEST_F(SpoolForPeople, IsListedAndAPostRemovedWhileNoReceiverHasIt) {
+  start();
+  servers_.kill(0);
+  for (uint64_t i = 1; i <= 2; ++i)
+    ASSERT_EQ(receiver_->post(postText(i), {"X-KYT-Sender: QPW", "X-KYT-Client-Name: c\xc3\xa4"}).status,
+              200);
+  EXPECT_EQ(run({"--list-spool"}).status, 1) << "the receiver has it";
+  EXPECT_EQ(run({"--remove-from-spool", "1"}).status, 1);
+  ASSERT_EQ(receiver_->terminate(), 0);
+  const ProgramRun both = run({"--list-spool"});
+  EXPECT_EQ(both.status, 0);
+  EXPECT_TRUE(std::regex_match(
+      both.text, std::regex("1 [0-9a-f]{64} 20[0-9-]{8}T[0-9:]{8}Z [0-9]+ bytes QPW/c\xc3\xa4\n"
+                            "2 [0-9a-f]{64} 20[0-9-]{8}T[0-9:]{8}Z [0-9]+ bytes QPW/c\xc3\xa4\n")))
+      << both.text;
+  EXPECT_EQ(run({"--remove-from-spool", "3"}).status, 1);
+  EXPECT_EQ(run({"--remove-from-spool", "1"}).status, 0);
+  EXPECT_TRUE(run({"--list-spool"}).text.starts_with("2 "));
+  receiver_->start();
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
 }
 
 }  // namespace

@@ -1,0 +1,27 @@
+// The spool's folder, for this process alone until the object ends. One thread at a time.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <utility>
+
+#include "platform/linux/base/Descriptors.h"
+
+namespace kyt::receiver {
+
+class SpoolFolder {
+ public:
+  explicit SpoolFolder(std::string folder) : folder_(std::move(folder)) {}
+
+  // What keeps it from being ours, or none. May be tried again.
+  [[nodiscard]] std::optional<std::string> take();
+  // Another process has it.
+  [[nodiscard]] bool isTaken() const { return isTaken_; }
+
+ private:
+  const std::string folder_;
+  Descriptor lock_;
+  bool isTaken_ = false;
+};
+
+}  // namespace kyt::receiver
