@@ -32,6 +32,11 @@ Error systemFailure(const std::string& what) {
   return failure(what + ": " + std::strerror(errno));
 }
 
+void setPatience(const Descriptor& socket) {
+  ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience);
+  ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience);
+}
+
 // The kernel's list of Unix sockets has a row for each with its flags, of which one says that it listens, and its path.
 bool isListeningAt(const std::string& path) {
   std::ifstream rows("/proc/net/unix");
@@ -61,8 +66,7 @@ std::variant<WindowClient, Error> WindowClient::connect(const std::string& root)
   std::memcpy(address.sun_path, path.data(), path.size());
   Descriptor socket = ownDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
   if (socket.get() < 0) return systemFailure("Cannot make a socket");
-  ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience);
-  ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience);
+  setPatience(socket);
   if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
     if (errno == ENOENT || errno == ECONNREFUSED || errno == ENOTDIR) return noDaemon(paths);
     if (errno == EACCES)
@@ -70,6 +74,10 @@ std::variant<WindowClient, Error> WindowClient::connect(const std::string& root)
                      ": only root, the daemon's user and the group in admin.group may look at the daemon");
     return systemFailure(path);
   }
+  return over(std::move(socket));
+}
+
+std::variant<WindowClient, Error> WindowClient::over(Descriptor socket) {
   WindowClient client(std::move(socket));
   if (auto error = client.shakeHands()) return std::move(*error);
   return client;

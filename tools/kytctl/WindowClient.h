@@ -23,6 +23,9 @@ class WindowClient {
   static constexpr int32_t kNoDaemon = 3;
   [[nodiscard]] static std::variant<WindowClient, Error> connect(const std::string& root);
 
+  // Over a connected stream socket.
+  [[nodiscard]] static std::variant<WindowClient, Error> over(Descriptor socket);
+
   // With one text as argument, or with none.
   [[nodiscard]] std::variant<Dictionary, Error> dictionary(
       std::string_view member, const std::optional<std::string_view>& argument = std::nullopt);      // a{sv}
