@@ -166,22 +166,30 @@ std::unique_ptr<UnixSocketAcceptor> administrationSocket(const Paths& paths,
 }
 
 // Waits until nobody erases what the daemon knows; whoever will keeps the lock meanwhile, as the daemon does while it runs.
-// False: an erasure goes on.
-bool waitForErasure(const std::string& folder, ErasureMark& mark, std::optional<DaemonLock>& lock, Log& log) {
+enum class Erasure { over, goesOn, endAsked };
+Erasure waitForErasure(const std::string& folder, ErasureMark& mark, std::optional<DaemonLock>& lock,
+                       StopSignals& signals, Log& log) {
+  bool isTold = false;
+  const auto goOn = [&] {
+    if (mark.isHeld() && !std::exchange(isTold, true))
+      log.normal("main: The owner erases what is known: waiting until that is done");
+    return !signals.isEndAsked();
+  };
   constexpr std::chrono::milliseconds kPause{5};
   const MonotonicTime end = std::chrono::steady_clock::now() + kErasurePatience;
   for (;;) {
     std::string problem;
     const Duration left =
         std::max(end - std::chrono::steady_clock::now(), std::chrono::steady_clock::duration(0));
-    lock = DaemonLock::take(folder, left, problem);
+    lock = DaemonLock::take(folder, left, problem, goOn);
+    if ((!lock || mark.isHeld()) && !goOn()) return Erasure::endAsked;
     if (!mark.isHeld()) {
       if (!lock) log.error("main: Cannot keep others from erasing: %s", problem.c_str());
       static_cast<void>(mark.remove());  // of an erasure that was cut off
-      return true;
+      return Erasure::over;
     }
     lock.reset();  // it was taken first, and is the eraser's
-    if (std::chrono::steady_clock::now() >= end) return false;
+    if (std::chrono::steady_clock::now() >= end) return Erasure::goesOn;
     std::this_thread::sleep_for(kPause);
   }
 }
@@ -217,9 +225,15 @@ int serve(const Configured& configured, Log& log, Counters& counters, ProgramIns
   }
   ErasureMark mark(paths.userDefaults());
   std::optional<DaemonLock> lock;
-  if (!waitForErasure(paths.userDefaults(), mark, lock, log)) {
-    log.error("main: The owner still erases what is known: not starting");
-    return kCouldNotStart;
+  switch (waitForErasure(paths.userDefaults(), mark, lock, stopSignals, log)) {
+    case Erasure::over:
+      break;
+    case Erasure::goesOn:
+      log.error("main: The owner still erases what is known: not starting");
+      return kCouldNotStart;
+    case Erasure::endAsked:
+      log.normal("main: Ending before the start is over");
+      return 0;
   }
   log.allowThreads();
   DaemonServices services({.system = {.settings = settings,

@@ -365,6 +365,24 @@ TEST_F(KytctlOwner, KeepsADaemonFromStartingWhileItErases) {
   EXPECT_NE(access(state("erase").c_str(), F_OK), 0) << "it was left behind";
 }
 
+TEST_F(KytctlOwner, LetsADaemonEndThatWaitsForIt) {
+  start();
+  end();
+  StandIn eraser([this] {
+    static ErasureMark mark(state(""));
+    return mark.set();
+  });
+  startDaemon();
+  ASSERT_TRUE(eventually([&] {
+    return logged("main: The owner erases what is known: waiting until that is done");
+  })) << daemonLog();
+  stage_->daemon()->signal(SIGHUP);
+  stage_->daemon()->signal(SIGTERM);
+  EXPECT_EQ(stage_->daemon()->wait(std::chrono::seconds(30)).value_or(-1), 0) << daemonLog();
+  EXPECT_FALSE(logged("not starting")) << daemonLog();
+  EXPECT_EQ(access(state("erase").c_str(), F_OK), 0) << "the eraser's mark";
+}
+
 TEST_F(KytctlOwner, ErasesAMessageLogThatTheDaemonBeganMeanwhile) {
   start();
   end();

@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <csignal>
 #include <string_view>
+#include <utility>
 
 #include "platform/linux/base/Descriptors.h"
 
@@ -43,12 +44,31 @@ StopSignals::StopSignals() : requests_(makeEventDescriptor()) {
   ignoreOthers();
 }
 
+int StopSignals::next() const {
+  signalfd_siginfo info = {};
+  return ::read(signals_.get(), &info, sizeof info) == sizeof info ? static_cast<int>(info.ssi_signo) : 0;
+}
+
+bool StopSignals::isEndAsked() {
+  while (ended_ == 0) {
+    const int signal = next();
+    if (signal == 0) break;
+    if (signal == SIGHUP)
+      isHangUpSeen_ = true;
+    else
+      ended_ = signal;
+  }
+  pollfd requested = {requests_.get(), POLLIN, 0};
+  return ended_ != 0 || ::poll(&requested, 1, 0) == 1;
+}
+
 int StopSignals::wait() {
+  if (const int ended = std::exchange(ended_, 0)) return ended;
+  if (std::exchange(isHangUpSeen_, false)) return SIGHUP;
   for (;;) {
     pollfd descriptors[] = {{signals_.get(), POLLIN, 0}, {requests_.get(), POLLIN, 0}};
     if (::poll(descriptors, 2, -1) <= 0) continue;
-    signalfd_siginfo info = {};
-    if (::read(signals_.get(), &info, sizeof info) == sizeof info) return static_cast<int>(info.ssi_signo);
+    if (const int signal = next()) return signal;
     if ((descriptors[1].revents & POLLIN) != 0) {
       clearEventDescriptor(requests_.get());
       return 0;

@@ -22,12 +22,19 @@ class StopSignals {
   // Blocks. The number of the signal that came (SIGTERM, SIGINT or SIGHUP), or 0 after request(). Also when it came
   // before the call.
   [[nodiscard]] int wait();
+  // Never blocks: whether wait() would return because the program is to end. It still does.
+  [[nodiscard]] bool isEndAsked();
   // Any thread, never blocks.
   void request();
 
  private:
+  // 0: none.
+  [[nodiscard]] int next() const;
+
   Descriptor signals_, requests_;
   int error_ = 0;
+  int ended_ = 0;              // a signal that was seen, and not told yet
+  bool isHangUpSeen_ = false;  // as well
 };
 
 // The process ends after so long with that status, whatever its threads wait for by then: with a line if standard error

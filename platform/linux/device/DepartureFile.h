@@ -33,6 +33,10 @@ class DaemonLock {
   // Waits so long at most. None: somebody keeps it, or the system refuses it; `problem` says so.
   [[nodiscard]] static std::optional<DaemonLock> take(const std::string& folder, Duration patience,
                                                       std::string& problem);
+  // `meanwhile`, which may be null, is called now and then; false: it is in vain, and errno says why.
+  [[nodiscard]] static std::optional<DaemonLock> take(const std::string& folder, Duration patience,
+                                                      std::string& problem,
+                                                      const std::function<bool()>& meanwhile);
   // The same for whoever erases: each process that keeps it meanwhile, or takes it before, is told to end (SIGTERM), once.
   // `told`: how many were.
   [[nodiscard]] static std::optional<DaemonLock> takeFromDaemon(const std::string& folder, Duration patience,
@@ -42,10 +46,6 @@ class DaemonLock {
 
  private:
   explicit DaemonLock(Descriptor file) : file_(std::move(file)) {}
-  // `meanwhile`, which may be null, is called now and then; false: it is in vain, and errno says why.
-  [[nodiscard]] static std::optional<DaemonLock> take(const std::string& folder, Duration patience,
-                                                      std::string& problem,
-                                                      const std::function<bool()>& meanwhile);
   Descriptor file_;  // no other of that file may be open in this process: closing one would give up the lock
 };
 
