@@ -1,4 +1,4 @@
-// A daemon in which a call that the test names fails.
+// A daemon in which a call that the test names fails, or takes as long as the test says.
 #pragma once
 
 #include <fcntl.h>
@@ -20,43 +20,33 @@
 
 namespace kyt {
 
-class FailingDaemon : public DaemonProcess {
+// The calls of a daemon that was not started yet: their library is loaded into it.
+class FailingCalls {
  public:
   static constexpr int kAlways = 1 << 30;
 
-  explicit FailingDaemon(const std::string& storebags) : DaemonProcess(storebags) {
-    const std::string path = root().write("failing", std::string(sizeof(kyt_failing_control), '\0'));
-    const int file = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
+  explicit FailingCalls(DaemonProcess& daemon)
+      : daemon_(daemon),
+        path_(daemon.root().write("failing", std::string(sizeof(kyt_failing_control), '\0'))) {
+    const int file = ::open(path_.c_str(), O_RDWR | O_CLOEXEC);
     void* mapped = ::mmap(nullptr, sizeof(kyt_failing_control), PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
     ::close(file);
     if (mapped == MAP_FAILED) std::abort();
     control_ = static_cast<kyt_failing_control*>(mapped);
-    path_ = path;
     addBeforeExecution([] {});
-    root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml", "consent = true\n");
   }
-  ~FailingDaemon() { ::munmap(control_, sizeof *control_); }
+  FailingCalls(const FailingCalls&) = delete;
+  FailingCalls& operator=(const FailingCalls&) = delete;
+  ~FailingCalls() { ::munmap(control_, sizeof *control_); }
 
-  // Besides what loads the library of failing calls.
+  // Besides what loads the library.
   void addBeforeExecution(std::function<void()> work) {
-    setBeforeExecution([path = path_, work = std::move(work)] {
+    daemon_.setBeforeExecution([path = path_, work = std::move(work)] {
       ::setenv("KYT_FAILING_CALLS", path.c_str(), 1);
       ::setenv("LD_PRELOAD", KYT_FAILING_LIBRARY, 1);
       work();
     });
   }
-  [[nodiscard]] int threadsNamed(std::string_view name) const {
-    int count = 0;
-    std::error_code ended;
-    for (const auto& thread :
-         std::filesystem::directory_iterator("/proc/" + std::to_string(process()) + "/task", ended)) {
-      std::string text;
-      std::ifstream(thread.path() / "comm") >> text;
-      count += text.starts_with(name) ? 1 : 0;
-    }
-    return count;
-  }
-  [[nodiscard]] int threads() const { return threadsNamed(""); }
 
   // From now on the calls from the `first` one on fail, `times` of them.
   void fail(kyt_failing_call call, int error, int first = 1, int times = 1) {
@@ -77,8 +67,30 @@ class FailingDaemon : public DaemonProcess {
   [[nodiscard]] int failures() const { return __atomic_load_n(&control_->failed, __ATOMIC_RELAXED); }
 
  private:
-  std::string path_;
+  DaemonProcess& daemon_;
+  const std::string path_;
   kyt_failing_control* control_;
+};
+
+class FailingDaemon : public DaemonProcess, public FailingCalls {
+ public:
+  explicit FailingDaemon(const std::string& storebags)
+      : DaemonProcess(storebags), FailingCalls(static_cast<DaemonProcess&>(*this)) {
+    root().write("var/lib/kytreportingd/defaults/com.vantu.diagnostics.toml", "consent = true\n");
+  }
+
+  [[nodiscard]] int threadsNamed(std::string_view name) const {
+    int count = 0;
+    std::error_code ended;
+    for (const auto& thread :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(process()) + "/task", ended)) {
+      std::string text;
+      std::ifstream(thread.path() / "comm") >> text;
+      count += text.starts_with(name) ? 1 : 0;
+    }
+    return count;
+  }
+  [[nodiscard]] int threads() const { return threadsNamed(""); }
 };
 
 }  // namespace kyt

@@ -111,6 +111,7 @@ WRAPPED(int, -1, lstat, (const char* restrict path, struct stat* restrict status
 WRAPPED(int, -1, fstat, (int fd, struct stat* status), (fd, status))
 WRAPPED(int, -1, rename, (const char* from, const char* to), (from, to))
 WRAPPED(int, -1, fsync, (int fd), (fd))
+WRAPPED(int, -1, fdatasync, (int fd), (fd))
 WRAPPED(int, -1, mkdir, (const char* path, mode_t mode), (path, mode))
 WRAPPED(DIR*, NULL, opendir, (const char* path), (path))
 WRAPPED(struct dirent*, NULL, readdir, (DIR * folder), (folder))

@@ -7,7 +7,7 @@
 #define KYT_FAILING_FUNCTIONS(X) \
   X(open) X(openat) X(read) X(write) X(recvmsg) X(sendmsg) X(recv) X(recvfrom) X(send) X(sendto) X(accept4) \
   X(socket) X(socketpair) X(bind) X(listen) X(connect) X(epoll_create1) X(epoll_ctl) X(epoll_wait) \
-  X(eventfd) X(timerfd_create) X(timerfd_settime) X(signalfd) X(stat) X(lstat) X(fstat) X(rename) X(fsync) \
+  X(eventfd) X(timerfd_create) X(timerfd_settime) X(signalfd) X(stat) X(lstat) X(fstat) X(rename) X(fsync) X(fdatasync) \
   X(mkdir) X(opendir) X(readdir) X(unlink) X(fchmod) X(chmod) X(flock) X(ftruncate) X(fork) \
   X(pthread_create) X(poll) X(getrandom) X(setsockopt) X(getsockopt) X(setrlimit) X(getrlimit) X(prctl) \
   X(mmap) X(statfs) X(waitpid) X(malloc_trim) X(seccomp_init) X(seccomp_attr_set) X(seccomp_rule_add_array)
