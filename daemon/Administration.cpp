@@ -139,10 +139,13 @@ std::optional<AdministrationRefusal> Administration::Window::dropOutbox(const Di
   if (const char* problem = readOutboxFilter(filter, wanted))
     return AdministrationRefusal{AdministrationRefusal::Why::wrongFilter, problem};
   if (!all_.hasOutbox()) return AdministrationRefusal{AdministrationRefusal::Why::isOff, kOutboxIsOff};
-  dropped = all_.outbox().drop(std::move(wanted.server), wanted.user);
+  const auto done = all_.outbox().drop(std::move(wanted.server), wanted.user);
+  dropped = done.posts;
   all_.sources_.platform.log.normal("administration: %llu posts of the outbox are dropped",
                                     static_cast<unsigned long long>(dropped));
-  return std::nullopt;
+  if (done.problem == nullptr) return std::nullopt;
+  return AdministrationRefusal{AdministrationRefusal::Why::failed,
+                               std::to_string(dropped) + " posts are dropped, but " + done.problem};
 }
 
 std::unique_ptr<Watcher> Administration::watch(WatchFilter filter, bool isOwner) const {

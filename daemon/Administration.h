@@ -36,9 +36,13 @@ struct ProcessFigures {
 
 // All empty where the settings want no outbox. They may wait for the disk.
 struct OutboxOperations {
+  struct Dropped {
+    uint64_t posts = 0;
+    const char* problem = nullptr;  // why they may still be on the disk; null: they are not
+  };
   std::function<std::vector<Dictionary>()> view;
   std::function<void()> flush;
-  std::function<uint64_t(std::optional<std::string> server, std::optional<uint32_t> user)> drop;
+  std::function<Dropped(std::optional<std::string> server, std::optional<uint32_t> user)> drop;
 };
 
 struct AdministrationSources {

@@ -132,7 +132,8 @@ OutboxOperations DaemonServices::outboxOperations() {
           .flush = [&outbox] { outbox.flush(); },
           .drop =
               [&outbox](std::optional<std::string> server, std::optional<uint32_t> user) {
-                return outbox.drop({.server = std::move(server), .user = user});
+                const Outbox::Dropped dropped = outbox.drop({.server = std::move(server), .user = user});
+                return OutboxOperations::Dropped{dropped.posts, dropped.problem};
               }};
 }
 

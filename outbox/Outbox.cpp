@@ -218,20 +218,24 @@ void Outbox::leave(KeptPosts::Entry& entry, Reason fate) {
   posts_.remove(entry);
 }
 
-uint64_t Outbox::drop(Filter filter) {
-  return queue_->sync([&]() -> uint64_t {
+Outbox::Dropped Outbox::drop(Filter filter) {
+  return queue_->sync([&] {
     queue_->assertCurrent();
-    uint64_t dropped = 0;
+    Dropped dropped;
     if (!isLoaded_) load();
     for (KeptPosts::Entry& entry : posts_.entries()) {
       const bool isMeant = !entry.isGone && (!filter.user || *filter.user == entry.user) &&
                            (!filter.server || *filter.server == entry.line->server);
       if (!isMeant) continue;
       leave(entry, Reason::outboxDropped);
-      ++dropped;
+      ++dropped.posts;
     }
-    removesForGood_ = removesForGood_ || dropped != 0;
+    removesForGood_ = removesForGood_ || dropped.posts != 0;
     turn();
+    if (!isLoaded_)
+      dropped.problem = "the disk does not say what there is";
+    else if (!removed_.empty() || removesForGood_)
+      dropped.problem = "the disk does not let them go yet; the daemon asks it again while it runs";
     return dropped;
   });
 }

@@ -110,8 +110,12 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   [[nodiscard]] bool isEmpty() const { return size_.load(std::memory_order_relaxed) == 0; }
 
   [[nodiscard]] std::vector<Server> list();
-  void flush();                                // sends without waiting for the time of the next try
-  [[nodiscard]] uint64_t drop(Filter filter);  // how many posts
+  void flush();  // sends without waiting for the time of the next try
+  struct Dropped {
+    uint64_t posts = 0;
+    const char* problem = nullptr;  // null: the disk has let them go
+  };
+  [[nodiscard]] Dropped drop(Filter filter);
 
   // Shut-down: sends nothing any more, but goes on keeping.
   void stopSending();

@@ -122,6 +122,7 @@ std::string_view errorName(AdministrationRefusal::Why why) {
     case AdministrationRefusal::Why::notAllowed:
       return wire::kErrorAccessDenied;
     case AdministrationRefusal::Why::isOff:
+    case AdministrationRefusal::Why::failed:
       return wire::kErrorFailed;
     case AdministrationRefusal::Why::wrongFilter:
       break;

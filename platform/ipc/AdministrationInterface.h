@@ -23,7 +23,7 @@ namespace kyt {
 using PassedSignal = Function<bool(const Dictionary& passed)>;
 
 struct AdministrationRefusal {
-  enum class Why : uint8_t { wrongFilter, tooMany, notAllowed, isOff };
+  enum class Why : uint8_t { wrongFilter, tooMany, notAllowed, isOff, failed };
   Why why = Why::wrongFilter;
   std::string text;
 };

@@ -63,13 +63,19 @@ class AdministrationTest : public AgentFixture {
   }
 
   ServerRecords servers_;
+  const char* dropProblem_ = nullptr;
   Administration administration_{{.platform = test_.platform,
                                   .sessions = class_.standings(),
                                   .storebags = agent_.storebags(),
                                   .servers = servers_,
                                   .version = "8.0.0",
                                   .since = 1000,
-                                  .outbox = {},
+                                  .outbox = {.view = [] { return std::vector<Dictionary>(); },
+                                             .flush = [] {},
+                                             .drop =
+                                                 [this](auto, auto) {
+                                                   return OutboxOperations::Dropped{3, dropProblem_};
+                                                 }},
                                   .connections = [] { return size_t{3}; },
                                   .process =
                                       [] {
@@ -91,6 +97,26 @@ TEST_F(AdministrationTest, IsForRootTheDaemonsUserAndTheGroupAlone) {
       "Only root, the daemon's own user and members of the group adm may look at the daemon (admin.group in "
       "kytreportingd.toml)");
   EXPECT_NE(refusalOf(look(65534)), nullptr);
+}
+
+TEST_F(AdministrationTest, SaysThatWhatIsDroppedMayStillBeOnTheDisk) {
+  const auto connection = look(0);
+  const auto drop = [&] {
+    std::optional<AdministrationRefusal> refusal;
+    connection->queue()->sync([&] {
+      uint64_t dropped = 0;
+      refusal = std::dynamic_pointer_cast<AdministrationInterface>(connection->anyExportedObject())
+                    ->dropOutbox({}, dropped);
+      EXPECT_EQ(dropped, 3U);
+    });
+    return refusal;
+  };
+  EXPECT_EQ(drop(), std::nullopt);
+  dropProblem_ = "the disk does not let them go";
+  const auto refused = drop();
+  ASSERT_NE(refused, std::nullopt);
+  EXPECT_EQ(refused->why, AdministrationRefusal::Why::failed);
+  EXPECT_EQ(refused->text, "3 posts are dropped, but the disk does not let them go");
 }
 
 TEST_F(AdministrationTest, MakesNoSession) {

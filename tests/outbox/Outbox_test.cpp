@@ -90,7 +90,7 @@ TEST_F(OutboxWithABadPost, HoldsNoOtherUp) {
     EXPECT_EQ(disk_->posts.size(), 1U);
     pass(hours(24));
     EXPECT_LE(sentBad_, 60U) << "half an hour between two tries";
-    EXPECT_EQ(outbox_->drop({}), 1U);
+    EXPECT_EQ(outbox_->drop({}).posts, 1U);
     stop();
   }
 }
@@ -465,7 +465,7 @@ TEST_F(OutboxTest, DropsAlsoWhatItHadNotReadYet) {
   start();
   disk_->problem.reset();
   test_.clock.advance(Outbox::kDiskPause);
-  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_EQ(outbox_->drop({}).posts, 1U);
   EXPECT_TRUE(disk_->posts.empty());
 }
 
@@ -672,7 +672,7 @@ TEST_F(OutboxTest, DeletesWhatWasCollectedBeforeTheConsentWasWithdrawnAndGivenAg
     postAndKeep("by the second");
     restart();
     EXPECT_EQ(disk_->posts.size(), 1U) << runs;
-    EXPECT_EQ(outbox_->drop({}), 1U);
+    EXPECT_EQ(outbox_->drop({}).posts, 1U);
     stop();
   }
 }
@@ -798,7 +798,7 @@ TEST_F(OutboxTest, ShowsWatchersTheEndOfWhatWasKeptBeforeTheyCame) {
   start();
   postAndKeep("body");
   const auto watcher = books_->watchers()->watch({});
-  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_EQ(outbox_->drop({}).posts, 1U);
   EXPECT_EQ(fatesOf(*watcher),
             std::vector<std::string>({"outbox-dropped -1 httppost", "outbox-dropped -1 httppost"}));
 }
@@ -939,13 +939,13 @@ TEST_F(OutboxTest, ListsSendsAndDropsForTheAdministrator) {
   EXPECT_EQ(servers[0].posts, 1U);
   EXPECT_EQ(servers[0].oldest, seconds(1));
   EXPECT_GT(servers[0].untilNextTry, Duration(0));
-  EXPECT_EQ(outbox_->drop({.server = std::nullopt, .user = 1000}), 1U);
+  EXPECT_EQ(outbox_->drop({.server = std::nullopt, .user = 1000}).posts, 1U);
   drain();
   EXPECT_EQ(row(1000).droppedFor(Reason::outboxDropped), 2U);
   outbox_->flush();
   drain();
   EXPECT_EQ(openBodies(), std::vector<std::string>({"b"}));
-  EXPECT_EQ(outbox_->drop({}), 1U);
+  EXPECT_EQ(outbox_->drop({}).posts, 1U);
   EXPECT_TRUE(outbox_->list().empty());
 }
 
@@ -992,6 +992,34 @@ TEST_F(OutboxTest, DeliversAWeeksOutageInOrderAndOnce) {
   const auto respond = [&](const URLRequest& request) -> std::optional<FakeURLSessionFactory::Reply> {
     FakeURLSessionFactory::Reply reply;
     if (!isUp) {
+TEST_F(OutboxTest, SaysThatTheDiskDoesNotLetGoOfWhatIsDropped) {
+  start();
+  waitLong();
+  postAndKeep("a");
+  postAndKeep("b");
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read only"};
+  const Outbox::Dropped dropped = outbox_->drop({});
+  EXPECT_EQ(dropped.posts, 2U);
+  ASSERT_NE(dropped.problem, nullptr);
+  EXPECT_NE(std::string(dropped.problem).find("let them go"), std::string::npos);
+  EXPECT_EQ(disk_->posts.size(), 2U);
+  disk_->problem.reset();
+  pass(Outbox::kDiskPause);
+  EXPECT_TRUE(disk_->posts.empty()) << "it is asked again";
+  EXPECT_EQ(outbox_->drop({}).problem, nullptr);
+}
+
+TEST_F(OutboxTest, SaysThatNothingIsDroppedOfWhatTheDiskDoesNotShow) {
+  start();
+  postAndKeep("a");
+  stop();
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "not there"};
+  start();
+  const Outbox::Dropped dropped = outbox_->drop({});
+  EXPECT_EQ(dropped.posts, 0U);
+  EXPECT_NE(dropped.problem, nullptr);
+}
+
       reply.error = Error{kKYTURLErrorDomain, 7, "unreachable"};
       return reply;
     }
