@@ -42,6 +42,7 @@ struct ServerLine {
   unsigned failures = 0;       // in a row
   bool isOpen = false;         // the last one was taken: several may go at a time
   bool isUnreachable = false;  // it failed without an answer
+  bool isPrompt = false;       // its last request did not take long
   int lastStatus = 0;          // 0: none yet, or no answer came
   MonotonicTime nextTry{}, lastTry{};
   MonotonicTime notBefore{};  // says the server

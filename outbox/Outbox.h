@@ -139,6 +139,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
     ServerLine* line = nullptr;
     std::string url;
     size_t bytes = 0, bodyBytes = 0;
+    MonotonicTime since{};
     OutboxBooks::Events events;
     std::shared_ptr<URLSession> session;
     std::shared_ptr<URLTask> task;
@@ -224,6 +225,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
 
   void sendWhatIsDue() REQUIRES(*queue_);
   void sendFrom(ServerLine& line) REQUIRES(*queue_);
+  [[nodiscard]] bool hasPlaceFor(const ServerLine& line) REQUIRES(*queue_);
   [[nodiscard]] bool send(KeptPosts::Entry& entry) REQUIRES(*queue_);
   [[nodiscard]] std::shared_ptr<URLSession> sessionFor(ServerLine& line, const StoredPost& post)
       REQUIRES(*queue_);

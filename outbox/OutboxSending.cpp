@@ -75,6 +75,7 @@ void Outbox::take(Answer& answer) {
   for (ServerLine::Sender& sender : line.senders)
     if (sender.session == sending.session) --sender.inFlight;
   inFlight_.erase(sending.number);
+  line.isPrompt = ports_.clock.monotonic() - sending.since < Limits::outboxSlowAnswer;
   if (answer.mayHaveLeft) tellOwner(sending.url, sending.events, sending.bodyBytes, !answer.isUnanswered);
   KeptPosts::Entry* entry = sending.isAbandoned ? nullptr : posts_.find(sending.number);
   if (entry == nullptr) return;
@@ -142,7 +143,10 @@ void Outbox::tellOwner(const std::string& url, const OutboxBooks::Events& events
 void Outbox::takeNews(const Inbox& inbox) {
   const MonotonicTime now = ports_.clock.monotonic();
   for (const std::string& server : inbox.answering)
-    if (ServerLine* line = posts_.line(server)) hearGood(*line);
+    if (ServerLine* line = posts_.line(server)) {
+      line->isPrompt = true;
+      hearGood(*line);
+    }
   if (!inbox.connectivityChanged && !inbox.flush) return;
   for (auto& [server, line] : posts_.lines()) {
     if (inbox.flush) {
@@ -159,14 +163,29 @@ void Outbox::takeNews(const Inbox& inbox) {
 void Outbox::sendWhatIsDue() {
   if (isStopping_ || !isLoaded_ || !removed_.empty() || diskRests()) return;
   if (ports_.clock.monotonic() < readingRestsUntil_) return;
-  for (auto& [server, line] : posts_.lines()) sendFrom(line);
+  std::vector<ServerLine*> due;
+  for (auto& [server, line] : posts_.lines())
+    if (line.posts != 0 && line.nextTry <= ports_.clock.monotonic()) due.push_back(&line);
+  // Where there is not a place for each, who has waited longest comes first.
+  std::sort(due.begin(), due.end(),
+            [](const ServerLine* a, const ServerLine* b) { return a->nextTry < b->nextTry; });
+  for (ServerLine* line : due) sendFrom(*line);
+}
+
+// Each silent server holds its place until its time-out: however many there are, they hold up one another alone.
+bool Outbox::hasPlaceFor(const ServerLine& line) {
+  if (inFlight_.size() >= Limits::maxOutboxRequestsInFlight) return false;
+  if (line.isPrompt) return true;
+  size_t toSlow = 0;
+  for (const auto& [number, sending] : inFlight_) toSlow += sending->line->isPrompt ? 0 : 1;
+  return toSlow < Limits::maxOutboxRequestsToSlowServers;
 }
 
 void Outbox::sendFrom(ServerLine& line) {
   const size_t most = line.isOpen ? kMostAtATime : 1;
   while (line.inFlight < most && ports_.clock.monotonic() >= line.nextTry) {
     if (line.inFlight > 0 && bytesInFlight_ >= Limits::maxOutboxBytesInFlight) return;
-    if (inFlight_.size() >= Limits::maxOutboxRequestsInFlight) return;
+    if (!hasPlaceFor(line)) return;
     const MonotonicTime now = ports_.clock.monotonic();
     KeptPosts::Entry* next = posts_.next(line, now);
     if (next == nullptr) {
@@ -213,6 +232,7 @@ bool Outbox::send(KeptPosts::Entry& entry) {
   sending->bodyBytes = post.body.view().size();
   sending->url = post.url;
   sending->session = sessionFor(line, post);
+  sending->since = ports_.clock.monotonic();
   sending->events = std::move(post.events);
   URLRequest request;
   request.method = "POST";

@@ -111,8 +111,11 @@ struct Limits {
   // A post that is not on its disk by then goes the usual way, so that no session waits longer for a disk that is stuck.
   static constexpr std::chrono::seconds outboxCommitTime{5};
   static constexpr size_t maxOutboxBytesInFlight = 4u << 20;
-  // Requests of it at a time, to all servers: servers that are silent leave room for what is posted meanwhile.
+  // Requests of it at a time, to all servers: servers that are silent leave room for what is posted meanwhile. Those to
+  // servers that take long to answer, or of which nothing is known yet: they leave room for the others.
   static constexpr size_t maxOutboxRequestsInFlight = 64;
+  static constexpr size_t maxOutboxRequestsToSlowServers = maxOutboxRequestsInFlight / 2;
+  static constexpr std::chrono::seconds outboxSlowAnswer{10};
   // Different contents of kept posts, by whose events they are and how many, that it knows without reading them: each is
   // some 200 bytes.
   static constexpr size_t maxKnownOutboxContents = 4096;

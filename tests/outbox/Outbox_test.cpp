@@ -1,6 +1,7 @@
 #include "outbox/Outbox.h"
 
 #include <algorithm>
+#include <set>
 
 #include "platform/base/Limits.h"
 #include "tests/outbox/OutboxFixture.h"
@@ -179,11 +180,53 @@ TEST_F(OutboxTest, LeavesRoomForNewPostsHoweverManyServersAreSilent) {
   for (size_t i = 0; i < kServers; ++i)
     postAndKeep("x", 1000, "https://silent" + std::to_string(i) + ".example.org");
   pass(seconds(6));
-  EXPECT_EQ(openBodies().size(), Limits::maxOutboxRequestsInFlight);
+  EXPECT_EQ(openBodies().size(), Limits::maxOutboxRequestsToSlowServers);
+  pass(minutes(1));
   const size_t before = sent();
   fail(last(), 28);
   pass(seconds(0));
   EXPECT_EQ(sent(), before + 1) << "the next one's turn";
+}
+
+// Their names come before and behind the other's, so that no order of names helps it.
+TEST_F(OutboxTest, KeepsNoServersRepeatsWaitingForServersThatAreSilent) {
+  start();
+  constexpr size_t kServers = 3 * Limits::maxOutboxRequestsInFlight;
+  for (size_t i = 0; i < kServers; ++i)
+    postAndKeep("silent", 1000,
+                "https://" + std::string(i % 2 == 0 ? "a" : "z") + std::to_string(i) + ".org");
+  pass(seconds(6));
+  EXPECT_EQ(openBodies().size(), Limits::maxOutboxRequestsToSlowServers);
+  for (int i = 0; i < 8; ++i) {
+    static_cast<void>(post("good"));
+    answer(last(), 503);
+  }
+  static_cast<void>(post("new"));
+  answer(last(), 200);
+  for (int i = 0; i < 10 && body(last()) != "good"; ++i) pass(seconds(1));
+  ASSERT_EQ(openBodies().size(), Limits::maxOutboxRequestsToSlowServers + 1);
+  for (int i = 0; i < 8; ++i)
+    for (size_t request = sent(); request-- > 0;)
+      if (network_->isOpen(request) && body(request) == "good") answer(request, 200);
+  EXPECT_EQ(row().delivered, 2U * 9);
+}
+
+TEST_F(OutboxTest, LetsServersThatAreSilentTakeTurns) {
+  start();
+  constexpr size_t kServers = 2 * Limits::maxOutboxRequestsToSlowServers;
+  for (size_t i = 0; i < kServers; ++i)
+    postAndKeep(std::to_string(i), 1000, "https://silent" + std::to_string(i) + ".example.org");
+  pass(seconds(6));
+  std::set<std::string> tried;
+  for (int round = 0; round < 2; ++round) {
+    for (const std::string& one : openBodies()) tried.insert(one);
+    pass(minutes(1));
+    const size_t until = sent();
+    for (size_t request = 0; request < until; ++request)
+      if (network_->isOpen(request)) network_->fail(request, Error{kKYTURLErrorDomain, 28, "silent"});
+    drain();
+  }
+  EXPECT_EQ(tried.size(), kServers);
 }
 
 TEST_F(OutboxTest, WaitsForARandomTimeUpToALimitThatDoublesUpToHalfAnHour) {
@@ -949,6 +992,34 @@ TEST_F(OutboxTest, ListsSendsAndDropsForTheAdministrator) {
   EXPECT_TRUE(outbox_->list().empty());
 }
 
+TEST_F(OutboxTest, SaysThatTheDiskDoesNotLetGoOfWhatIsDropped) {
+  start();
+  waitLong();
+  postAndKeep("a");
+  postAndKeep("b");
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read only"};
+  const Outbox::Dropped dropped = outbox_->drop({});
+  EXPECT_EQ(dropped.posts, 2U);
+  ASSERT_NE(dropped.problem, nullptr);
+  EXPECT_NE(std::string(dropped.problem).find("let them go"), std::string::npos);
+  EXPECT_EQ(disk_->posts.size(), 2U);
+  disk_->problem.reset();
+  pass(Outbox::kDiskPause);
+  EXPECT_TRUE(disk_->posts.empty()) << "it is asked again";
+  EXPECT_EQ(outbox_->drop({}).problem, nullptr);
+}
+
+TEST_F(OutboxTest, SaysThatNothingIsDroppedOfWhatTheDiskDoesNotShow) {
+  start();
+  postAndKeep("a");
+  stop();
+  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "not there"};
+  start();
+  const Outbox::Dropped dropped = outbox_->drop({});
+  EXPECT_EQ(dropped.posts, 0U);
+  EXPECT_NE(dropped.problem, nullptr);
+}
+
 TEST_F(OutboxTest, TellsTheOwnerOfEachTimeThatAPostMayHaveLeft) {
   start();
   postAndKeep();
@@ -992,34 +1063,6 @@ TEST_F(OutboxTest, DeliversAWeeksOutageInOrderAndOnce) {
   const auto respond = [&](const URLRequest& request) -> std::optional<FakeURLSessionFactory::Reply> {
     FakeURLSessionFactory::Reply reply;
     if (!isUp) {
-TEST_F(OutboxTest, SaysThatTheDiskDoesNotLetGoOfWhatIsDropped) {
-  start();
-  waitLong();
-  postAndKeep("a");
-  postAndKeep("b");
-  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "read only"};
-  const Outbox::Dropped dropped = outbox_->drop({});
-  EXPECT_EQ(dropped.posts, 2U);
-  ASSERT_NE(dropped.problem, nullptr);
-  EXPECT_NE(std::string(dropped.problem).find("let them go"), std::string::npos);
-  EXPECT_EQ(disk_->posts.size(), 2U);
-  disk_->problem.reset();
-  pass(Outbox::kDiskPause);
-  EXPECT_TRUE(disk_->posts.empty()) << "it is asked again";
-  EXPECT_EQ(outbox_->drop({}).problem, nullptr);
-}
-
-TEST_F(OutboxTest, SaysThatNothingIsDroppedOfWhatTheDiskDoesNotShow) {
-  start();
-  postAndKeep("a");
-  stop();
-  disk_->problem = PostStoreProblem{PostStoreProblem::Kind::unavailable, "not there"};
-  start();
-  const Outbox::Dropped dropped = outbox_->drop({});
-  EXPECT_EQ(dropped.posts, 0U);
-  EXPECT_NE(dropped.problem, nullptr);
-}
-
       reply.error = Error{kKYTURLErrorDomain, 7, "unreachable"};
       return reply;
     }
