@@ -322,34 +322,4 @@ void Outbox::stopSending() {
   });
 }
 
-std::vector<Outbox::Server> Outbox::list() {
-  return queue_->sync([this] {
-    queue_->assertCurrent();
-    const MonotonicTime now = ports_.clock.monotonic();
-    std::map<const ServerLine*, Server> lines;
-    for (const KeptPosts::Entry& entry : posts_.entries()) {
-      if (entry.isGone) continue;
-      Server& server = lines[entry.line];
-      if (server.users.empty()) server.oldest = std::chrono::seconds(seconds() - entry.born);
-      Server::User& user = server.users[entry.user];
-      ++user.posts;
-      user.bytes += entry.bytes;
-    }
-    std::vector<Server> servers;
-    for (auto& [name, line] : posts_.lines()) {
-      if (line.posts == 0) continue;
-      Server& server = servers.emplace_back(std::move(lines[&line]));
-      server.server = name;
-      server.posts = line.posts;
-      server.bytes = line.bytes;
-      server.inFlight = line.inFlight;
-      server.failures = line.failures;
-      server.lastStatus = line.lastStatus;
-      for (const auto& [number, aside] : line.aside) server.failingAlone += aside.strikes != 0 ? 1 : 0;
-      if (line.inFlight == 0) server.untilNextTry = std::max(Duration(0), line.nextTry - now);
-    }
-    return servers;
-  });
-}
-
 }  // namespace kyt
