@@ -5,6 +5,7 @@ from __future__ import annotations
 import logging
 from typing import Any, Callable, Dict, Mapping, Optional
 
+from ._errors import ClosedError, NotConnectedError
 from ._session import Session
 
 
@@ -16,8 +17,8 @@ class LoggingHandler(logging.Handler):
     The payload has logger, level, function and line, and of a record with arguments the unformatted text, which is the
     same for all its records. A text without arguments may have been put together by the program (an f-string, an
     exception) and hold what nobody meant to report: it goes along only with formatted=True, as the formatted message
-    does. `payload` makes another one of the record. Never raises and never blocks: what the queue has no room for is
-    counted there.
+    does. `payload` makes another one of the record. Never raises and never blocks: what the queue has no room for, and
+    what comes after the session's end, is counted in its statistics.
     """
 
     def __init__(
@@ -40,6 +41,8 @@ class LoggingHandler(logging.Handler):
         try:
             level = min(max(record.levelno // 10 * 10, logging.DEBUG), logging.CRITICAL)
             self._session.send(self._category, level, self._payload_of(record))
+        except (ClosedError, NotConnectedError):
+            pass  # a program logs while it ends, too
         except Exception:  # pylint: disable=broad-except  # as handlers do
             self.handleError(record)
 

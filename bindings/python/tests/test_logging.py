@@ -57,3 +57,13 @@ def test_a_closed_session_is_no_error_of_who_logs(kyt_listener, monkeypatch):
     session.close()
     logger_of(kyt.LoggingHandler(session, 30)).warning("x")
     assert session.statistics().dropped_closed == 1
+
+
+def test_a_record_after_the_sessions_end_prints_nothing(kyt_listener, capsys):
+    session = kyt.Session(20)
+    logger = logging.Logger("late")
+    logger.addHandler(kyt.LoggingHandler(session, category=30))
+    session.finish()
+    logger.warning("while %s", "ending")
+    assert capsys.readouterr().err == ""
+    assert session.statistics().dropped_closed == 1
