@@ -122,7 +122,11 @@ class Listener:
         return [event for event in self._events if event["event"] == kind]
 
     def __enter__(self) -> "Listener":
-        self.start()
+        try:
+            self.start()
+        except BaseException:
+            shutil.rmtree(self._folder, ignore_errors=True)
+            raise
         return self
 
     def __exit__(

@@ -33,3 +33,11 @@ def test_every_text_comes_back_as_it_was(kyt_listener):
         for text in texts:
             session.send(1, 1, text=text)
     assert [message["payload"]["text"] for message in kyt_listener.wait_for("message", len(texts))] == texts
+
+
+def test_a_listener_that_cannot_start_leaves_no_folder(tmp_path, monkeypatch):
+    monkeypatch.setattr("tempfile.tempdir", str(tmp_path))
+    with pytest.raises(FileNotFoundError):
+        with Listener(kytctl=str(tmp_path / "none")):
+            pass
+    assert not list(tmp_path.iterdir())
