@@ -2,12 +2,13 @@
 
 from __future__ import annotations
 
+import contextvars
 import functools
 import inspect
 import threading
 import time
 from types import TracebackType
-from typing import TYPE_CHECKING, Any, Callable, Dict, List, Optional, Type, TypeVar, cast
+from typing import TYPE_CHECKING, Any, Callable, Dict, Optional, Tuple, Type, TypeVar, cast
 
 from ._errors import InvalidError
 from ._values import Dictionary
@@ -16,6 +17,10 @@ if TYPE_CHECKING:
     from ._session import Session
 
 F = TypeVar("F", bound=Callable[..., Any])
+
+
+# The Timers that this thread or task is within, the innermost last. A task begins with a copy of its maker's.
+_begun: "contextvars.ContextVar[Tuple[Tuple[Timer, float], ...]]" = contextvars.ContextVar("_begun", default=())
 
 
 class _Measure:
@@ -48,18 +53,16 @@ class Timer(_Measure):
         @session.timed(20, 2)
         def search(words): ...      # also async functions
 
-    One Timer may be used again and from several threads. Sending raises nothing, and keeps the caller's exception and
+    One Timer may be used again, from several threads and tasks. A generator is timed from its first step to its end; an
+    asynchronous one cannot be decorated. Sending raises nothing, and keeps the caller's exception and
     result as they are: what the session does not take, ended or without a daemon, is in its statistics.
     """
 
     def __init__(self, session: "Session", category: int, type: int, /, **fields: Any) -> None:
         super().__init__(session, category, type, fields)
-        self._begun = threading.local()
 
     def __enter__(self) -> "Timer":
-        if not hasattr(self._begun, "times"):
-            self._begun.times = []
-        cast(List[float], self._begun.times).append(time.perf_counter())
+        _begun.set(_begun.get() + ((self, time.perf_counter()),))
         return self
 
     def __exit__(
@@ -68,7 +71,13 @@ class Timer(_Measure):
         value: Optional[BaseException],
         traceback: Optional[TracebackType],
     ) -> None:
-        self._send(time.perf_counter() - self._begun.times.pop(), kind)
+        now = time.perf_counter()
+        begun = _begun.get()
+        for place in reversed(range(len(begun))):
+            if begun[place][0] is self:
+                _begun.set(begun[:place] + begun[place + 1 :])
+                self._send(now - begun[place][1], kind)
+                return
 
     def _send(self, duration: float, error: Optional[Type[BaseException]]) -> None:
         if error is None:
@@ -92,6 +101,26 @@ class Timer(_Measure):
                     self._send(time.perf_counter() - begun, error)
 
             return cast(F, timed_later)
+
+        if inspect.isasyncgenfunction(function):
+            raise InvalidError("an asynchronous generator cannot be timed: use a with statement within it")
+        if inspect.isgeneratorfunction(function):
+
+            @functools.wraps(function)
+            def timed_steps(*arguments: Any, **named: Any) -> Any:
+                begun = time.perf_counter()  # of this generator: others run between its steps
+                error: Optional[Type[BaseException]] = None
+                try:
+                    return (yield from function(*arguments, **named))
+                except GeneratorExit:  # whoever asked wanted no more
+                    raise
+                except BaseException as raised:
+                    error = type(raised)
+                    raise
+                finally:
+                    self._send(time.perf_counter() - begun, error)
+
+            return cast(F, timed_steps)
 
         @functools.wraps(function)
         def timed(*arguments: Any, **named: Any) -> Any:

@@ -1,5 +1,6 @@
 import asyncio
 import threading
+import time
 
 import pytest
 
@@ -118,3 +119,52 @@ def test_a_sum_that_finds_no_room_goes_along_with_the_next(kyt_listener, monkeyp
         counter.add(5)
     (message,) = kyt_listener.wait_for("message")
     assert message["payload"]["count"] == 12 and message["payload"]["seconds"] > 0
+
+
+def test_tasks_within_one_timer_keep_their_own_beginnings(kyt_listener):
+    async def first(timer, leave):
+        with timer:
+            await leave.wait()
+
+    async def run(session):
+        timer, leave = session.timed(1, 1), asyncio.Event()
+        task = asyncio.ensure_future(first(timer, leave))
+        begun = time.perf_counter()
+        while time.perf_counter() - begun < 0.05:
+            await asyncio.sleep(0)
+        with timer:  # its beginning is the last one of this thread
+            leave.set()
+            await task
+
+    with kyt.Session(20) as session:
+        asyncio.run(run(session))
+    assert kyt_listener.wait_for("message", 2)[0]["payload"]["duration"] >= 0.04
+
+
+def test_a_generator_is_timed_to_its_end(kyt_listener):
+    with kyt.Session(20) as session:
+
+        @session.timed(1, 1)
+        def steps():
+            begun = time.perf_counter()
+            while time.perf_counter() - begun < 0.05:
+                got = yield 1
+            return got
+
+        steps_now = steps()
+        next(steps_now)
+        with pytest.raises(StopIteration) as end:
+            while True:
+                steps_now.send("last")
+    assert end.value.value == "last"
+    [message] = kyt_listener.wait_for("message")
+    assert message["payload"]["duration"] >= 0.05
+
+
+def test_an_asynchronous_generator_is_not_decorated(kyt_listener):
+    with kyt.Session(20) as session:
+        with pytest.raises(kyt.InvalidError, match="asynchronous generator"):
+
+            @session.timed(1, 1)
+            async def steps():
+                yield 1
