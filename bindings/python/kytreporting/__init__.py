@@ -11,7 +11,8 @@ to the daemon. A daemon that is not there, dies or comes back is waited for and 
 is lost without being counted: see Session.statistics().
 
 Every operation may be called from any thread. After os.fork() the child goes on with a session of its own, opened at
-its first use. What is queued when the program ends is sent, for a second at most.
+its first use. What is queued when the program ends is sent, for a second at most, and so is what a process of
+multiprocessing (fork or spawn) queued whose function returned; os._exit() and a signal lose what is queued.
 
 The page "Reporting from a program" has the whole story: PROGRAMS.md in the documents of libkytreporting-dev.
 """
@@ -28,7 +29,7 @@ from ._errors import (
     TimedOutError,
 )
 from ._logging import LoggingHandler
-from ._session import Flag, Session, State, send_single, total_statistics
+from ._session import Flag, Session, State, asend_single, send_single, total_statistics
 from ._statistics import Statistics
 from ._timing import Counter, Timer
 from ._values import Payload, Scalar
@@ -54,6 +55,7 @@ __all__ = [
     "Statistics",
     "TimedOutError",
     "Timer",
+    "asend_single",
     "send_single",
     "total_statistics",
 ]

@@ -10,6 +10,7 @@ import ctypes
 import enum
 import functools
 import itertools
+import math
 import os
 import secrets
 import sys
@@ -25,9 +26,10 @@ from ._errors import ClosedError, Error, InvalidError, error_of
 from ._library import AGGREGATION_CALLBACK, STATE_CALLBACK, Figures, Options, lib
 from ._statistics import Statistics, statistics_of
 from ._timing import Counter, Timer
-from ._values import Array, Dictionary, Payload
+from ._values import Array, Dictionary, Payload, text_bytes
 
 _REASON_BYTES = 512
+_MOST_SECONDS = 4_294_967  # 49 days: 32 bits of milliseconds
 _LAST_SECOND = 1.0  # what the end of a program waits for messages that are queued
 
 
@@ -80,6 +82,7 @@ class _Program:
     def __init__(self) -> None:
         self.opening = threading.RLock()  # while something is; a callback of a call that fails at once may open more
         self.ended = False
+        self.watches_process = 0  # the one whose multiprocessing is to call _at_exit()
 
     @contextlib.contextmanager
     def goes_on(self) -> Iterator[None]:
@@ -99,8 +102,13 @@ _program = _Program()
 
 def _tell_state(state: int, why: bytes, number: int) -> None:
     session = _sessions.get(number)
-    if session is not None and session._told is not None:
-        _calls.run(session._told, State(state), why.decode("utf-8", "replace"))
+    if session is None or session._told is None:
+        return
+    change = (State(state), why.decode("utf-8", "replace"))
+    if session._opener == threading.get_ident():  # its end, within the call that opens it: there is no session yet
+        session._early.append(change)
+    else:
+        _calls.run(session._told, *change)
 
 
 def _tell_aggregated(
@@ -115,8 +123,18 @@ _on_state_change = STATE_CALLBACK(_tell_state)
 _on_aggregated = AGGREGATION_CALLBACK(_tell_aggregated)
 
 
-def _bytes_of(text: Optional[str]) -> Optional[bytes]:
-    return None if text is None else os.fsencode(text)
+def _path_bytes(path: Union[str, "os.PathLike[str]"]) -> bytes:
+    encoded = os.fsencode(path)
+    if b"\0" in encoded:  # which would end the path for the library
+        raise InvalidError("a path with a NUL character names nothing")
+    return encoded
+
+
+def _milliseconds(what: str, seconds: float) -> int:
+    """Whole ones, and at least one of what is not 0: for the library 0 has a meaning of its own."""
+    if not 0 <= seconds <= _MOST_SECONDS:
+        raise InvalidError(f"{what}: {seconds} is no number of seconds from 0 to {_MOST_SECONDS}")
+    return math.ceil(seconds * 1000)
 
 
 def _checked(information: Mapping[str, Any]) -> None:
@@ -140,7 +158,8 @@ class Session:
     client_type: 0 to 23, which kind of client; types 5 to 23 have a storebag.
     client, service: choose the storebag's entry for this program, and go with every record.
     user_info: further entries that go with every record.
-    session_id: 32 bits, yours; a random one otherwise. client_version: 16 bits.
+    session_id: 32 bits, yours; a random one otherwise,
+        of each process its own. client_version: 16 bits.
     batch: events are collected until a flush, a threshold or the session's end.
     require_user_info: the owner's consent, and country, device, filter and sampling rules apply. False is for what says
         nothing about anyone.
@@ -194,13 +213,16 @@ class Session:
             self._information["HierarchyToken"] = {"TokenID": hierarchy[0], "Level": hierarchy[1]}
         _checked(self._information)
         self._user = _names(client, service, user_info)
-        self._socket = socket
+        self._socket = None if socket is None else _path_bytes(socket)
+        for bound in (max_queued_messages, max_queued_bytes):
+            if not 0 <= bound < 2**63:
+                raise InvalidError(f"a bound of {bound}: the queue holds a number of messages and bytes")
         self._bounds = (max_queued_messages, max_queued_bytes)
         self._told = on_state_change
         self._aggregates = on_aggregated
-        self._deadline = call_deadline
+        self._deadline = _milliseconds("call_deadline", call_deadline)
         self._waits = finish_waits_for_daemon
-        self._flush_interval = flush_interval
+        self._flush_interval = _milliseconds("flush_interval", flush_interval)
         self._needs_daemon = not wait_for_daemon
         self._configured = configure
         self._shared: Dict[str, Any] = {}
@@ -208,8 +230,12 @@ class Session:
         self._counters: "weakref.WeakSet[Counter]" = weakref.WeakSet()
         self._ended = False
         self._lock = threading.Lock()  # while it is opened
+        self._opener = 0  # the thread that opens it
+        self._early: List[Tuple[State, str]] = []  # what that one was told meanwhile
         self._pointer: Optional[int] = None
         self._finalizer: Optional[weakref.finalize] = None
+        self._forked = False  # this process is a child of the one that made it
+        self._random_id = session_id is None
         self._number = next(_numbers)  # under which the library's callbacks find it
         _sessions[self._number] = self
         self._handle()
@@ -225,16 +251,28 @@ class Session:
                 if self._ended:
                     raise ClosedError("the session is closed")
                 with _program.goes_on():
-                    self._pointer = self._opened()
-            return self._pointer
+                    self._opener = threading.get_ident()
+                    try:
+                        self._pointer = self._opened()
+                    finally:
+                        self._opener = 0
+            pointer = self._pointer
+            early, self._early = self._early, []
+        for change in early:  # without the lock: the program's function may use the session
+            if self._told is not None:
+                _calls.run(self._told, *change)
+        return pointer
 
     def _opened(self) -> int:
+        multiprocessing_process = sys.modules.get("multiprocessing.process")
+        if multiprocessing_process is not None and multiprocessing_process.parent_process() is not None:
+            _finish_with_process()
         options = Options(size=ctypes.sizeof(Options))
-        options.socket_path = _bytes_of(self._socket)
+        options.socket_path = self._socket
         options.max_queued_messages, options.max_queued_bytes = self._bounds
-        options.call_deadline_milliseconds = int(self._deadline * 1000) or -1
+        options.call_deadline_milliseconds = self._deadline or -1
         options.finish_waits_for_daemon = self._waits
-        options.flush_interval_milliseconds = int(self._flush_interval * 1000)
+        options.flush_interval_milliseconds = self._flush_interval
         options.ends_without_daemon = self._needs_daemon
         if self._told is not None:
             options.on_state_change = _on_state_change
@@ -264,6 +302,11 @@ class Session:
         self._finalizer = None
         self._pointer = None
         self._lock = threading.Lock()
+        self._opener = 0
+        self._early = []
+        self._forked = True
+        if self._random_id:
+            self._information["SessionID"] = secrets.randbits(32)
         for counter in list(self._counters):
             counter._start_anew()
 
@@ -332,11 +375,17 @@ class Session:
 
     def configure(self, timeout: Optional[float] = None) -> Optional[List[str]]:
         """Asks the daemon to configure the session. The names of the live back ends; None without a storebag."""
+        return _calls.wait(self._configuration(), timeout)
+
+    async def aconfigure(self) -> Optional[List[str]]:
+        """configure() for asyncio."""
+        return await asyncio.wrap_future(self._configuration())
+
+    def _configuration(self) -> "concurrent.futures.Future[Optional[List[str]]]":
         self._configured = True
         number, future = self._begin()
         lib.kyt_session_configure(self._handle(), _calls.on_states, number)
-        states: Optional[List[str]] = _calls.wait(future, timeout)
-        return states
+        return future
 
     def fetch_states(
         self, user_info: Optional[Payload] = None, *, timeout: Optional[float] = None
@@ -359,10 +408,16 @@ class Session:
 
     def fetch_display_url(self, timeout: Optional[float] = None) -> Optional[str]:
         """The address for people that the storebag names."""
+        return _calls.wait(self._display_url(), timeout)
+
+    async def afetch_display_url(self) -> Optional[str]:
+        """fetch_display_url() for asyncio."""
+        return await asyncio.wrap_future(self._display_url())
+
+    def _display_url(self) -> "concurrent.futures.Future[Optional[str]]":
         number, future = self._begin()
         lib.kyt_session_fetch_display_url(self._handle(), _calls.on_text, number)
-        url: Optional[str] = _calls.wait(future, timeout)
-        return url
+        return future
 
     def flush(self, timeout: Optional[float] = None) -> Optional[str]:
         """Posts what is batched, and waits for the servers. The text of what was posted, where it may be shown.
@@ -384,18 +439,31 @@ class Session:
 
     def upload_file(self, path: Union[str, "os.PathLike[str]"], timeout: Optional[float] = None) -> bool:
         """Whether a back end took the file. It is opened at once, with this program's rights."""
+        return _calls.wait(self._upload(path), timeout)
+
+    async def aupload_file(self, path: Union[str, "os.PathLike[str]"]) -> bool:
+        """upload_file() for asyncio."""
+        return await asyncio.wrap_future(self._upload(path))
+
+    def _upload(self, path: Union[str, "os.PathLike[str]"]) -> "concurrent.futures.Future[bool]":
+        encoded = _path_bytes(path)
         number, future = self._begin()
-        lib.kyt_session_upload_file(self._handle(), os.fsencode(path), _calls.on_success, number)
-        taken: bool = _calls.wait(future, timeout)
-        return taken
+        lib.kyt_session_upload_file(self._handle(), encoded, _calls.on_success, number)
+        return future
 
     def upload_log_data(self, log_data: Sequence[Any], timeout: Optional[float] = None) -> bool:
         """Whether a back end took the data."""
+        return _calls.wait(self._upload_data(log_data), timeout)
+
+    async def aupload_log_data(self, log_data: Sequence[Any]) -> bool:
+        """upload_log_data() for asyncio."""
+        return await asyncio.wrap_future(self._upload_data(log_data))
+
+    def _upload_data(self, log_data: Sequence[Any]) -> "concurrent.futures.Future[bool]":
         with Array(log_data) as array:
             number, future = self._begin()
             lib.kyt_session_upload_log_data(self._handle(), array.pointer, _calls.on_success, number)
-        taken: bool = _calls.wait(future, timeout)
-        return taken
+        return future
 
     def _begin(self) -> "Tuple[int, concurrent.futures.Future[Any]]":
         self._handle()  # raises before a number is given out
@@ -412,7 +480,7 @@ class Session:
 
     def remove_shared_data(self, key: str) -> None:
         """Takes one entry of it back."""
-        lib.kyt_session_remove_shared_data(self._handle(), key.encode())
+        lib.kyt_session_remove_shared_data(self._handle(), text_bytes(key))
         self._shared.pop(key, None)
 
     def set_digest_key(self, key: bytes, algorithm: int = 0) -> None:
@@ -425,20 +493,26 @@ class Session:
     @property
     def state(self) -> State:
         """Where the session stands."""
-        return State(lib.kyt_session_state(self._handle()))
+        return State.NO_DAEMON if self._unopened() else State(lib.kyt_session_state(self._handle()))
 
     @property
     def state_reason(self) -> str:
         """Why, as a text for people."""
+        if self._unopened():
+            return "nothing was sent from this forked process yet"
         lib.kyt_session_state_reason(self._handle(), _places.text, _REASON_BYTES)
         return _places.read()
 
     def statistics(self) -> Statistics:
         """Where the session's messages are. In a forked child they begin at zero."""
         figures = Figures()
-        if self._pointer is not None or not self._ended:
+        if not self._unopened():
             lib.kyt_session_read_statistics(self._handle(), ctypes.byref(figures), ctypes.sizeof(figures))
         return statistics_of(figures)
+
+    def _unopened(self) -> bool:
+        """In a forked child: whoever only looks opens nothing."""
+        return self._pointer is None and self._forked and not self._lock.locked()
 
     # --- the end
 
@@ -447,6 +521,7 @@ class Session:
 
         Gives up at once where no daemon ever took anything and none is there. False also when it has ended before.
         """
+        milliseconds = _milliseconds("timeout", min(max(0.0, timeout), _MOST_SECONDS))
         if self._pointer is None and (self._ended or not self._has_sums()):  # nothing was sent in this forked child
             self._ended = True
             return True
@@ -454,7 +529,7 @@ class Session:
             if not self._ended:
                 counter.send()
         self._ended = True
-        return bool(lib.kyt_session_finish(self._pointer, max(0, int(timeout * 1000))))
+        return bool(lib.kyt_session_finish(self._pointer, milliseconds))
 
     def _has_sums(self) -> bool:
         return any(counter._has_sum() for counter in list(self._counters))
@@ -533,11 +608,49 @@ def send_single(
 
     "finished": the daemon had a storebag and has offered the event to its back ends; or "storebag not available".
     """
+    names = (client_type, client, service, user_info, session_id, require_user_info, socket)
+    return _calls.wait(_single(category, type, payload, fields, *names), timeout) or ""
+
+
+async def asend_single(
+    category: int,
+    type: int,
+    payload: Optional[Payload] = None,
+    /,
+    *,
+    client_type: int,
+    client: Optional[str] = None,
+    service: Optional[str] = None,
+    user_info: Optional[Payload] = None,
+    session_id: int = 1,
+    require_user_info: bool = True,
+    socket: Optional[str] = None,
+    **fields: Any,
+) -> str:
+    """send_single() for asyncio."""
+    names = (client_type, client, service, user_info, session_id, require_user_info, socket)
+    answer = await asyncio.wrap_future(_single(category, type, payload, fields, *names))
+    return answer or ""
+
+
+def _single(
+    category: int,
+    type: int,
+    payload: Optional[Payload],
+    fields: Mapping[str, Any],
+    client_type: int,
+    client: Optional[str],
+    service: Optional[str],
+    user_info: Optional[Payload],
+    session_id: int,
+    require_user_info: bool,
+    socket: Optional[str],
+) -> "concurrent.futures.Future[Optional[str]]":
     information = {"SessionID": session_id, "ClientType": client_type, "RequireUserInfo": require_user_info}
     _checked(information)
     user_entries = _names(client, service, user_info)
     options = Options(size=ctypes.sizeof(Options))
-    options.socket_path = _bytes_of(socket)
+    options.socket_path = None if socket is None else _path_bytes(socket)
     with Dictionary(information) as session_info, Dictionary(user_entries) as user:
         with _message(category, type, payload, fields) as message:
             options.session_info = session_info.pointer
@@ -548,7 +661,7 @@ def send_single(
                 lib.kyt_send_single_message(
                     ctypes.byref(options), category, type, message.pointer, _calls.on_text, number
                 )
-    return _calls.wait(future, timeout) or ""
+    return future
 
 
 def _at_exit() -> None:
@@ -567,8 +680,18 @@ def _at_exit() -> None:
         lib.kyt_close_all()
 
 
+def _finish_with_process(_: object = None) -> None:
+    """A process of multiprocessing ends by os._exit(), and does before it what is registered with it."""
+    if _program.watches_process != os.getpid():
+        _program.watches_process = os.getpid()
+        sys.modules["multiprocessing.util"].Finalize(None, _at_exit, exitpriority=0)
+
+
 def _after_fork_in_child() -> None:
     _calls.forget_all()
+    multiprocessing_util = sys.modules.get("multiprocessing.util")
+    if multiprocessing_util is not None:  # which forgets what is to be done at the end when its process begins
+        multiprocessing_util.register_after_fork(_program, _finish_with_process)
     _program.opening = threading.RLock()  # another thread may have held it
     for session in list(_sessions.values()):
         session._leave_to_parent()

@@ -12,19 +12,22 @@ from ._library import lib
 Scalar = Union[str, bool, int, float, bytes, bytearray, memoryview, datetime.datetime, None]
 Payload = Mapping[str, Any]
 """Keys are texts; values are texts, whole numbers of 64 bits, floats, booleans, bytes, datetimes, and lists and mappings
-of these. None is an entry that is left out."""
+of these. A mapping's entry that is None is left out; a list has no None."""
 
 _MOST_NESTED = 64  # the wire allows 32 containers in a message
 
 
-def _text(value: str) -> bytes:
+def text_bytes(value: str) -> bytes:
     if "\0" in value:
         raise InvalidError("a text with a NUL character cannot be sent")
     return value.encode("utf-8", "replace")
 
 
 def _seconds(value: datetime.datetime) -> float:
-    return value.timestamp()
+    try:
+        return value.timestamp()
+    except (OverflowError, ValueError, OSError) as error:  # the local time's year 0, for one
+        raise InvalidError(f"the date {value} cannot be sent: {error}") from None
 
 
 def _unknown(value: object) -> InvalidError:
@@ -67,7 +70,7 @@ class Dictionary(_Object):
         if not isinstance(key, str):
             raise InvalidError(f"a key of the type {type(key).__name__}: keys are texts")
         if value is not None:
-            _put(lib, "kyt_dictionary_set_", (self.pointer, _text(key)), value, self._depth)
+            _put(lib, "kyt_dictionary_set_", (self.pointer, text_bytes(key)), value, self._depth)
 
 
 class Array(_Object):
@@ -88,7 +91,7 @@ def _put(library: Any, prefix: str, where: Sequence[Any], value: Any, depth: int
         getattr(library, prefix + kind)(*where, *what)
 
     if isinstance(value, str):
-        put("string", _text(value))
+        put("string", text_bytes(value))
     elif isinstance(value, bool):
         put("bool", value)
     elif isinstance(value, int):

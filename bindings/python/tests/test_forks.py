@@ -1,4 +1,8 @@
 import json
+import subprocess
+import sys
+
+import pytest
 
 from conftest import eventually
 
@@ -119,3 +123,79 @@ def test_a_session_that_was_closed_before_the_fork_stays_closed(kyt_listener, pr
     )
     assert said == "the session is closed\n"
     assert eventually(lambda: len(kyt_listener.events("end")) == 1)
+
+
+def test_a_child_that_only_looks_opens_nothing(kyt_listener, program):
+    said = program(
+        """
+        import os
+        import kytreporting as kyt
+        with kyt.Session(20) as session:
+            session.configure()
+            if os.fork() == 0:
+                print(session.statistics().accepted, session.state.name, session.state_reason, flush=True)
+                os._exit(0)
+            os.wait()
+        """
+    )
+    assert said == "0 NO_DAEMON nothing was sent from this forked process yet\n"
+    kyt_listener.wait_for("end")
+    assert len(kyt_listener.events("session")) == 1
+
+
+def test_a_child_has_a_random_session_id_of_its_own(kyt_listener, program):
+    program(
+        """
+        import os
+        import kytreporting as kyt
+        with kyt.Session(20) as session:
+            session.configure()
+            if os.fork() == 0:
+                session.send(1, 1)
+                session.finish()
+                os._exit(0)
+            os.wait()
+        """
+    )
+    kyt_listener.wait_for("end", 2)
+    first, second = kyt_listener.events("session")
+    assert first["sessionInfo"]["SessionID"] != second["sessionInfo"]["SessionID"]
+
+
+@pytest.mark.parametrize("method", ["fork", "spawn"])
+def test_what_a_process_of_multiprocessing_queued_is_sent_at_its_end(kyt_listener, tmp_path, method):
+    path = tmp_path / "report.py"
+    path.write_text(
+        "import multiprocessing, sys\n"
+        "import kytreporting as kyt\n"
+        "session = kyt.Session(20)\n"
+        "counter = session.counter(2, 1, interval=3600)\n"
+        "def work(number):\n"
+        "    session.send(1, number)\n"
+        "    counter.add(3)\n"
+        "if __name__ == '__main__':\n"
+        f"    context = multiprocessing.get_context('{method}')\n"
+        "    processes = [context.Process(target=work, args=(number,)) for number in range(3)]\n"
+        "    for process in processes:\n"
+        "        process.start()\n"
+        "    for process in processes:\n"
+        "        process.join()\n"
+    )
+    subprocess.run([sys.executable, str(path)], check=True, timeout=60)
+    messages = kyt_listener.wait_for("message", 6)
+    assert sorted((m["category"], m["type"]) for m in messages) == [(1, 0), (1, 1), (1, 2), (2, 1), (2, 1), (2, 1)]
+
+
+def test_a_sum_alone_leaves_with_a_process_of_multiprocessing(kyt_listener, program):
+    program(
+        """
+        import multiprocessing
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        counter = session.counter(2, 1, interval=3600)
+        process = multiprocessing.get_context("fork").Process(target=counter.add)
+        process.start()
+        process.join()
+        """
+    )
+    assert kyt_listener.wait_for("message")[0]["payload"]["count"] == 1

@@ -152,6 +152,11 @@ def test_asyncio_waits_without_blocking_the_loop(kyt_listener):
             with pytest.raises(kyt.BackEndError, match="Nothing to flush"):
                 await session.aflush()
             assert await session.asend_with_reply(1, 2) is None
+            assert await session.aconfigure() == ["httppost"]
+            assert await session.afetch_display_url() == "URL not available"
+            assert await session.aupload_file(__file__)
+            assert await session.aupload_log_data(["line"])
+            assert await kyt.asend_single(1, 2, client_type=20, client="x", a=1) == "finished"
             before = ticks
             assert await session.afinish()
             assert ticks > before

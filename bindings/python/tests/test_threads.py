@@ -100,3 +100,22 @@ def test_a_callback_that_would_wait_for_itself_is_told(kyt_listener):
     session.finish()
     session.close()
     assert "may not wait" in errors[0]
+
+
+def test_a_session_without_a_thread_ends_and_its_state_can_be_read(program):
+    said = program(
+        """
+        import os, resource
+        import kytreporting as kyt
+        if os.getuid() == 0:
+            os.setuid(65534)  # the limit is nothing to root
+        resource.setrlimit(resource.RLIMIT_NPROC, (0, 0))
+        class Watched(kyt.Session):
+            def told(self, state, reason):
+                print(state.name, self.state.name, reason == self.state_reason)
+            def __init__(self):
+                super().__init__(20, socket="/nonexistent/socket", on_state_change=self.told)
+        Watched().close()
+        """
+    )
+    assert said.splitlines()[0] == "NO_DAEMON NO_DAEMON True"

@@ -104,3 +104,46 @@ def test_category_and_type_are_whole_numbers(kyt_listener):
         for category in (-1, 2**32, 2**70, "1", 1.0):
             with pytest.raises(kyt.InvalidError, match="whole numbers"):
                 session.send(category, 1)
+
+
+def test_a_path_with_a_nul_is_refused_not_cut_off(kyt_listener):
+    with pytest.raises(kyt.InvalidError, match="NUL"):
+        kyt.Session(20, socket=kyt_listener.socket_path + "\0more")
+    with kyt.Session(20) as session:
+        with pytest.raises(kyt.InvalidError, match="NUL"):
+            session.upload_file(__file__ + "\0.txt")
+    assert not kyt_listener.events("file")
+
+
+def test_a_shared_entrys_name_is_taken_back_as_it_was_given(kyt_listener):
+    with kyt.Session(20) as session:
+        session.update_shared_data({"a\udc80": 1})
+        session.remove_shared_data("a\udc80")
+    kyt_listener.wait_for("end")
+    assert len(kyt_listener.events("sharedData")) == 2
+
+
+def test_a_date_without_a_moment_is_invalid(kyt_listener):
+    with kyt.Session(20) as session:
+        with pytest.raises(kyt.InvalidError, match="the date"):
+            session.send(1, 1, at=datetime.datetime(1, 1, 1))
+
+
+@pytest.mark.parametrize("wrong", [-1.0, float("inf"), float("nan"), 5e6])
+def test_seconds_that_cannot_be_meant_are_invalid(wrong):
+    with pytest.raises(kyt.InvalidError, match="call_deadline"):
+        kyt.Session(20, call_deadline=wrong)
+    with pytest.raises(kyt.InvalidError, match="flush_interval"):
+        kyt.Session(20, flush_interval=wrong)
+
+
+def test_a_negative_bound_is_invalid():
+    with pytest.raises(kyt.InvalidError, match="bound"):
+        kyt.Session(20, max_queued_messages=-1)
+
+
+def test_a_deadline_below_a_millisecond_is_a_deadline(tmp_path):
+    session = kyt.Session(20, socket=str(tmp_path / "none"), call_deadline=0.0005)
+    with pytest.raises(kyt.TimedOutError, match="no daemon within"):
+        session.flush(timeout=20)
+    session.close()
