@@ -84,6 +84,12 @@ void FakeSession::uploadLogData(Value data, SuccessErrorReply reply) {
 void FakeSession::sendMessageWithSessionInfo(Dictionary info, std::optional<Dictionary> user,
                                              uint16_t category, uint16_t type,
                                              std::optional<Dictionary> payload, StringReply reply) {
+  if (!info.contains(kKYTReportingSessionInfoClientType) ||
+      !info.contains(kKYTReportingSessionInfoSessionID)) {  // the daemon drops the message
+    if (!records_->isAlive()) return keep(std::move(reply));
+    if (reply) reply("Could not retrieve identifiers from sessionInfo");
+    return;
+  }
   Event made = event(Kind::message);
   made.single = true;
   made.category = category;

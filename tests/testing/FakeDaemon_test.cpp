@@ -68,6 +68,22 @@ TEST(FakeDaemonOfTests, KeepsWhatAProgramTellsIt) {
             R"({"event":"message","connection":1,"category":10,"type":1,"flag":3,"payload":{"step":1}})");
 }
 
+TEST(FakeDaemonOfTests, DropsASingleMessageWithoutIdentifiersAsTheDaemonDoes) {
+  FakeDaemon daemon;
+  ASSERT_EQ(daemon.start(), std::nullopt);
+  for (const Dictionary& incomplete : {Dictionary{{"SessionID", 5U}}, Dictionary{{"ClientType", 20}}}) {
+    KYTReporting::Options options;
+    options.socketPath = daemon.socketPath();
+    options.sessionInfo = incomplete;
+    std::promise<std::string> answer;
+    KYTReporting::sendSingleMessage(
+        std::move(options), 1, 2, std::nullopt,
+        [&answer](std::string text, const std::optional<Error>&) { answer.set_value(std::move(text)); });
+    EXPECT_EQ(answer.get_future().get(), "Could not retrieve identifiers from sessionInfo");
+  }
+  EXPECT_TRUE(daemon.events(Kind::message).empty());
+}
+
 TEST(FakeDaemonOfTests, TakesSingleMessagesAndUploads) {
   FakeDaemon daemon;
   ASSERT_EQ(daemon.start(), std::nullopt);
