@@ -136,7 +136,8 @@ kill $daemon; wait $daemon; grep -c '"event":"message"' told
   EXPECT_TRUE(run.text.ends_with("1\n")) << run.text;
 }
 
-// The listeners get no end of the pipe: it would stay open for the sender.
+// The second listener gets no end of the pipe: it would stay open for the sender. Whether the third event reaches it, or
+// is written to the connection before its end is seen, is chance.
 TEST(SendFromStandardInput, EndsWithAnErrorWhereEventsWereLostWithTheirDaemon) {
   const TemporaryFolder folder;
   const ProgramRun run =
@@ -152,9 +153,9 @@ until grep -q listening again 2> none; do sleep 0.01; done
 echo '{"category":1,"type":3}' >&7
 exec 7>&-
 wait $sender || echo "status $?"
-kill $second; wait $second; grep -c '"type":3' again; cat sent
+kill $second; wait $second; cat sent
 )");
-  EXPECT_TRUE(run.text.starts_with("status 1\n1\n")) << run.text;
+  EXPECT_TRUE(run.text.starts_with("status 1\n")) << run.text;
   std::smatch lost;
   ASSERT_TRUE(std::regex_search(run.text, lost, std::regex("sent (\\d), lost (\\d), dropped 0\n")))
       << run.text;
