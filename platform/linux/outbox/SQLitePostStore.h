@@ -1,6 +1,6 @@
-// Posts in one file of SQLite, "outbox.sqlite", readable by the process's user alone: the outbox's, and a receiver's spool. A write-ahead log, and
-// each change on the disk before it returns (synchronous=FULL). The daemon has the file for itself, so SQLite needs no
-// file of shared memory. An empty outbox of more than a MiB has its file removed.
+// Posts in one file of SQLite, "outbox.sqlite", readable by the process's user alone: the outbox's, and a receiver's spool.
+// A write-ahead log, and each change on the disk before it returns (synchronous=FULL). The process has the file for itself,
+// so SQLite needs no file of shared memory. Empty and larger than a MiB it is removed.
 //
 // The file is made under another name and renamed when it is whole, so that an empty one has lost what was in it. It names
 // the version of its tables twice (user_version, application_id). One of a later version is left alone: the store is
