@@ -2,6 +2,8 @@
 // read.
 #include <gtest/gtest.h>
 #include <nats/nats.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -91,8 +93,9 @@ class Reader : public ::testing::Test {
     natsConnection_Destroy(connection_);
   }
   [[nodiscard]] std::string url() const { return "nats://127.0.0.1:" + std::to_string(port_); }
-  void startReader(std::vector<std::string> further = {}) {
-    std::vector<std::string> arguments = {"--server", url(), "--database", postgres_->database()};
+  void startReader(std::vector<std::string> further = {}, const std::string& database = "") {
+    std::vector<std::string> arguments = {"--server", url(), "--database",
+                                          database.empty() ? postgres_->database() : database};
     arguments.insert(arguments.end(), further.begin(), further.end());
     tools::ChildProcess::Options how;
     how.outputFile = folder_ / "reader.log";
@@ -297,6 +300,40 @@ TEST_F(Reader, WaitsForADatabaseThatCannotStoreAndSetsNothingAside) {
   static_cast<void>(postgres_->query("DROP TRIGGER refuse_53100 ON kyt_posts"));
   EXPECT_TRUE(holds("SELECT string_agg(id, ' ') FROM kyt_posts", idOf("good")));
   EXPECT_TRUE(holds("SELECT string_agg(id, ' ') FROM kyt_unreadable", idOf("no-gzip")));
+}
+
+TEST_F(Reader, StoresALargePostWhateverTimeTheDatabaseGivesAStatement) {
+  ASSERT_EQ(postgres_->query("ALTER ROLE CURRENT_USER SET statement_timeout = '100ms'").find("ERROR"),
+            std::string::npos);
+  startReader();
+  put("large", gzipped(message(1, 200'000)));
+  put("good", gzipped(message(2)));
+  EXPECT_TRUE(
+      holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_posts", idOf("good") + " " + idOf("large")));
+  EXPECT_EQ(said().find("statement timeout"), std::string::npos) << said();
+}
+
+TEST_F(Reader, GivesUpADatabaseThatSaysNothingAndEndsWhenItIsTold) {
+  const int silent = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t size = sizeof address;
+  ASSERT_EQ(::bind(silent, reinterpret_cast<sockaddr*>(&address), size), 0);
+  ASSERT_EQ(::listen(silent, 8), 0);
+  ASSERT_EQ(::getsockname(silent, reinterpret_cast<sockaddr*>(&address), &size), 0);
+  startReader({}, "host=127.0.0.1 dbname=kyt port=" + std::to_string(ntohs(address.sin_port)));
+  const int taken = ::accept4(silent, nullptr, nullptr, SOCK_CLOEXEC);
+  ASSERT_GE(taken, 0);
+  EXPECT_EQ(end(), 0) << said();
+  EXPECT_NE(said().find("timeout expired"), std::string::npos) << said();
+  ::close(taken);
+  ::close(silent);
+}
+
+TEST_F(Reader, LetsTheUserSayHowLongADatabaseMaySayNothing) {
+  startReader({}, "host=127.0.0.1 connect_timeout=none");
+  EXPECT_TRUE(eventually([this] { return said().find("\"none\"") != std::string::npos; })) << said();
 }
 
 TEST_F(Reader, LosesAndDoublesNothingWhereItDiesOrTheDatabaseDoes) {
