@@ -393,5 +393,19 @@ TEST_F(KytctlWindow, SaysThatTheDaemonRunsWithoutItsAdministrationSocket) {
       << run.text;
 }
 
+// A collector's file that a full disk has cut would stand in place of a whole one.
+TEST_F(KytctlWindow, EndsWithAnErrorWhenItCannotWrite) {
+  lay();
+  startDaemon();
+  const std::string program =
+      "timeout 30 '" + stage_->program("kytctl") + "' --root '" + stage_->folder() + "' ";
+  for (const char* command : {"status", "sessions", "books", "storebags", "metrics", "metrics --json",
+                              "log-level", "reload --json", "watch", "owner show"}) {
+    const ProgramRun run = runProgram("sh", {"-c", program + command + " >/dev/full"});
+    EXPECT_EQ(run.status, 1) << command;
+    EXPECT_TRUE(run.text.starts_with("kytctl: can't write the output")) << command << ": " << run.text;
+  }
+}
+
 }  // namespace
 }  // namespace kyt

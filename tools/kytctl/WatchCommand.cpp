@@ -101,11 +101,12 @@ int watchCommand(const std::string& root, const WatchOptions& options) {
     std::fputs(line("TIME", "USER", "CLIENT:SERVICE", "BACK END", "EVENT", "FATE").c_str(), stdout);
     std::fflush(stdout);
   }
-  for (;;) {
+  while (std::ferror(stdout) == 0) {
     auto passed = window.nextPassed();
     if (const auto* error = std::get_if<Error>(&passed)) return failedAtWindow(*error);
     print(std::get<Dictionary>(passed), options.json);
   }
+  return 1;  // main() says why
 }
 
 }  // namespace kyt::tools

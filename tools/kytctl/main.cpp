@@ -1,7 +1,11 @@
 // kytctl: the command for people: sends events, reads and writes user defaults, grants and withdraws the
 // consent, shows and erases what is known of the owner, makes keys, signs and checks storebags, and shows how the running
 // daemon stands.
+#include <algorithm>
+#include <cerrno>
 #include <cstdint>
+#include <cstdio>
+#include <cstring>
 #include <limits>
 #include <optional>
 #include <string>
@@ -39,6 +43,7 @@ struct Arguments {
   std::string level, server;
   bool json = false;
   int status = 0;
+  int unwritten = 1;  // the status at least, of a command whose output is lost
 };
 
 constexpr char kFinished[] =
@@ -170,7 +175,10 @@ void addExplain(const Command& program, Arguments& a) {
       .between(0.0, 1.0);
   explain.flag("--json", o.json, "Print one JSON object");
   explain.ends(kExplained);
-  explain.runs([&a] { a.status = explainCommand(a.connection.root, a.explain); });
+  explain.runs([&a] {
+    a.unwritten = 2;  // 1 would tell that the event does not leave
+    a.status = explainCommand(a.connection.root, a.explain);
+  });
 }
 
 void addDefaults(const Command& program, Arguments& a) {
@@ -224,7 +232,10 @@ void addEntitlements(const Command& program, Arguments& a) {
   const CommandOption pid =
       check.option("--pid", a.check.pid, "A process").between(1, std::numeric_limits<int32_t>::max());
   check.option("--user", a.check.user, "Any process of a user, by name or number").excludes(pid);
-  check.runs([&a] { a.status = entitlementsCheckCommand(a.connection.root, a.check); });
+  check.runs([&a] {
+    a.unwritten = 2;  // 1 would tell that the client is refused
+    a.status = entitlementsCheckCommand(a.connection.root, a.check);
+  });
 }
 
 // What is signed, and what of it the command line decides.
@@ -305,7 +316,10 @@ void addEvents(const Command& program, Arguments& a) {
   check.option("bag", a.events.bag, "A document, or a bag (.json, .toml or .plist)").required();
   check.flag("--json", a.events.json, "Print one JSON object");
   check.ends(kEventsChecked);
-  check.runs([&a] { a.status = checkEventsCommand(a.events); });
+  check.runs([&a] {
+    a.unwritten = 2;  // 1 would tell of findings
+    a.status = checkEventsCommand(a.events);
+  });
   const Command generate = events.command("generate", "Write source code that fills and sends its events");
   generate.option("file", a.generate.file, "What the program reports, events.toml").required();
   generate.option("--lang", a.generate.language, "The language").required().oneOf({"c", "c++", "python"});
@@ -373,6 +387,15 @@ void addOutbox(const Command& program, Arguments& a) {
   drop.runs([&a] { a.status = outboxDropCommand(a.connection.root, a.drop); });
 }
 
+// Says so, where it is not: who redirects it to a file would take a part for the whole.
+bool isOutputWritten() {
+  errno = 0;
+  if (std::fflush(stdout) == 0 && std::ferror(stdout) == 0) return true;
+  const std::string why = errno != 0 ? std::string(": ") + std::strerror(errno) : std::string();
+  failed("can't write the output" + why);
+  return false;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -393,5 +416,5 @@ int main(int argc, char** argv) {
   addWindow(program, arguments);
   addOutbox(program, arguments);
   if (const auto status = program.parse(argc, argv)) return *status;
-  return arguments.status;
+  return isOutputWritten() ? arguments.status : std::max(arguments.status, arguments.unwritten);
 }
