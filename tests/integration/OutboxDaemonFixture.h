@@ -15,6 +15,7 @@
 
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/TestClient.h"
+#include "tests/support/Programs.h"
 #include "tests/support/ReadFile.h"
 #include "tests/support/TestHTTPServer.h"
 
@@ -117,6 +118,12 @@ class OutboxOfTheDaemon : public ::testing::Test {
   [[nodiscard]] std::map<std::string, std::vector<int>> takenIn() const {
     const std::lock_guard lock(mutex_);
     return takenIn_;
+  }
+  // The daemon has heard of each post that it kept.
+  [[nodiscard]] bool isEmpty() const {
+    return runProgram(std::string(KYT_PROGRAMS) + "/kytctl",
+                      {"--root", daemon_.root().path(), "outbox", "list"})
+               .text.find("Nothing waits in the outbox") != std::string::npos;
   }
   [[nodiscard]] std::string folder() const { return daemon_.root() / "var/lib/kytreportingd/outbox"; }
   [[nodiscard]] std::string ofProcess(const std::string& name) const {

@@ -78,8 +78,8 @@ TEST_F(OutboxOnADiskOfItsOwn, LosesWhatFindsNoRoomAndDeliversTheRest) {
   const ProgramRun room = runProgram("nsenter", {"-t", process, "-U", "--preserve-credentials", "-m", "mount",
                                                  "-o", "remount,size=1m", folder()});
   ASSERT_EQ(room.status, 0) << room.text;
-  const auto isEmpty = [&] { return booked("outbox") == 0; };
-  EXPECT_TRUE(eventually(isEmpty) || eventually(isEmpty) || eventually(isEmpty)) << daemon_.log();
+  const auto isDone = [&] { return booked("outbox") == 0; };
+  EXPECT_TRUE(eventually(isDone) || eventually(isDone) || eventually(isDone)) << daemon_.log();
   EXPECT_GE(booked("delivered"), before + kept);
   EXPECT_TRUE(closes());
   for (const auto& [body, times] : taken()) EXPECT_EQ(times, 1);

@@ -81,7 +81,7 @@ TEST_F(OutboxOfTheDaemon, SendsNothingAgainWhoseAnswerBreaksOffAfterAGoodStatus)
   ASSERT_FALSE(kept.empty());
   breakOff(true);
   take(100);
-  ASSERT_TRUE(eventually([&] { return taken().size() >= kept.size(); })) << daemon_.log();
+  ASSERT_TRUE(eventually([&] { return taken().size() >= kept.size() && isEmpty(); })) << daemon_.log();
   end();
   start();
   TestClient another(daemon_.socketPath(), kTorvel, "plain");
