@@ -61,7 +61,8 @@ std::unique_ptr<Stand> Stand::make(const Options& options) {
   stage.consent = options.consent;
   stage.extraSettings =
       "[limits]\nmax_connections_per_user = 16384\nmax_batch_bytes = 1073741824\n"
-      "max_bytes_per_user = 17179869184\nmax_descriptors_per_user = 1048576\n";
+      "max_bytes_per_user = 17179869184\nmax_descriptors_per_user = 1048576\n" +
+      options.settings;
   auto made = tools::Stage::make(std::move(stage));
   if (auto* error = std::get_if<Error>(&made)) return failed(error->localizedDescription);
   stand->stage_ = std::move(std::get<std::unique_ptr<tools::Stage>>(made));

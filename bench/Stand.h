@@ -23,8 +23,9 @@ class Stand {
   struct Options {
     std::string programs, share;
     bool consent = false;
-    bool tls = false;  // of the posts
-    int batch = 50;    // events of a post
+    bool tls = false;           // of the posts
+    int batch = 50;             // events of a post
+    std::string settings = {};  // appended to kytreportingd.toml
   };
   // Null, with a line on standard error, when the daemon does not come up.
   [[nodiscard]] static std::unique_ptr<Stand> make(const Options& options);
@@ -53,6 +54,7 @@ class Stand {
   // As many more as are missing; fewer when the daemon refuses one.
   void openSessions(std::vector<Peer>& peers, size_t wanted) const;
   [[nodiscard]] int pid() { return stage_->daemon()->pid(); }
+  [[nodiscard]] const std::string& folder() const { return stage_->folder(); }
   [[nodiscard]] std::string socketPath() const { return stage_->socketPath(); }
   [[nodiscard]] SinkServer& sink() { return sink_; }
 
