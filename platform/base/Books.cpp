@@ -5,6 +5,7 @@
 #include <functional>
 #include <map>
 #include <numeric>
+#include <span>
 #include <tuple>
 #include <unordered_set>
 
@@ -319,19 +320,24 @@ void BookedEvents::tellWatchers(std::optional<Reason> dropped) const {
 }
 
 void BookedEvents::tellWatchers(PassedEvent fate) const {
-  BookedEventsReader tallies(*this);
+  Watchers& watchers = *shown_->watchers;
   ToldBody body;
   if (fate.isFirstOfPost) body.body = fate.post->body();
-  for (size_t i = 0; i < size_; ++i) {
-    const Tally* tally = tallies.next();
-    const EventKind kind = i < shown_->kinds.size() ? shown_->kinds[i] : EventKind();
-    if (tally == nullptr || !shown_->watchers->want(tally->program(), kind)) continue;
-    PassedEvent event = tally->passed(kind, fate.dropped);
-    event.backEnd = shown_->backEnd;
-    event.isKept = fate.isKept;
-    event.rule = fate.rule;
-    event.post = fate.post;
-    shown_->watchers->tell(std::move(event), fate.isFirstOfPost ? &body : nullptr);
+  std::span<const EventKind> kinds = shown_->kinds;
+  for (const Run& run : runs_) {
+    const std::span<const EventKind> own = kinds.first(std::min(run.events, kinds.size()));
+    kinds = kinds.subspan(own.size());
+    if (!run.tally || watchers.loseAll(run.tally->program(), own, run.events)) continue;
+    for (size_t i = 0; i < run.events; ++i) {
+      const EventKind kind = i < own.size() ? own[i] : EventKind();
+      if (!watchers.want(run.tally->program(), kind)) continue;
+      PassedEvent event = run.tally->passed(kind, fate.dropped);
+      event.backEnd = shown_->backEnd;
+      event.isKept = fate.isKept;
+      event.rule = fate.rule;
+      event.post = fate.post;
+      watchers.tell(std::move(event), fate.isFirstOfPost ? &body : nullptr);
+    }
   }
   if (fate.isFirstOfPost) shown_->post->forgetBody();
 }

@@ -1,5 +1,6 @@
 #include "platform/base/Watchers.h"
 
+#include <algorithm>
 #include <thread>
 #include <utility>
 
@@ -29,9 +30,12 @@ struct Watchers::Ring {
   }
 };
 
+bool WatchFilter::admitsProgram(const ReportingProgram& program) const {
+  return (!user || *user == program.user) && (!client || *client == cutName(program.clientName));
+}
+
 bool WatchFilter::admits(const ReportingProgram& program, EventKind kind) const {
-  return (!user || *user == program.user) && (!client || *client == cutName(program.clientName)) &&
-         (!category || *category == kind.category);
+  return admitsProgram(program) && (!category || *category == kind.category);
 }
 
 WatchedBody::WatchedBody(std::shared_ptr<Watchers> watchers, std::string_view text)
@@ -71,15 +75,22 @@ std::unique_ptr<Watcher> Watchers::watch(WatchFilter filter, bool isOwner) {
 // Whoever tells says so before it looks at the ring, and whoever takes the ring away looks for tellers afterwards: so one of
 // the two sees the other. Who finds no ring at first stays out, so that there is an end to the wait.
 template <typename Use>
-void Watchers::forEachRing(const ReportingProgram& program, EventKind kind, Use use) {
+void Watchers::forEachRing(const ReportingProgram& program, Use use) {
   for (size_t number = 0; number < places_.size(); ++number) {
     Place& place = places_[number];
     if (place.ring.load(std::memory_order_relaxed) == nullptr) continue;
     place.tellers.fetch_add(1);
     Ring* ring = place.ring.load();
-    if (ring != nullptr && ring->filter.admits(program, kind)) use(*ring, number);
+    if (ring != nullptr && ring->filter.admitsProgram(program)) use(*ring, number);
     place.tellers.fetch_sub(1);
   }
+}
+
+template <typename Use>
+void Watchers::forEachRing(const ReportingProgram& program, EventKind kind, Use use) {
+  forEachRing(program, [&](Ring& ring, size_t number) {
+    if (ring.filter.admits(program, kind)) use(ring, number);
+  });
 }
 
 bool Watchers::want(const ReportingProgram& program, EventKind kind) {
@@ -89,6 +100,22 @@ bool Watchers::want(const ReportingProgram& program, EventKind kind) {
   if (!hasRoom)
     forEachRing(program, kind, [](Ring& ring, size_t) { ring.lost.fetch_add(1, std::memory_order_relaxed); });
   return hasRoom;
+}
+
+// A watcher that reads nothing has a full ring for as long as it lasts: a post of a thousand events looks at it once.
+bool Watchers::loseAll(const ReportingProgram& program, std::span<const EventKind> kinds, size_t count) {
+  bool hasRoom = false;
+  forEachRing(program, [&hasRoom](const Ring& ring, size_t) { hasRoom = hasRoom || ring.events.hasRoom(); });
+  if (hasRoom) return false;
+  forEachRing(program, [&](Ring& ring, size_t) {
+    const auto isOf = [category = ring.filter.category](EventKind kind) {
+      return kind.category == *category;
+    };
+    const auto lost =
+        ring.filter.category ? static_cast<size_t>(std::count_if(kinds.begin(), kinds.end(), isOf)) : count;
+    ring.lost.fetch_add(lost, std::memory_order_relaxed);
+  });
+  return true;
 }
 
 void Watchers::tell(PassedEvent event, ToldBody* body) {

@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -101,6 +102,7 @@ struct WatchFilter {
   bool bodies = false;
   // `program` as it is, or with its names cut.
   [[nodiscard]] bool admits(const ReportingProgram& program, EventKind kind) const;
+  [[nodiscard]] bool admitsProgram(const ReportingProgram& program) const;
 };
 
 // One watcher's end. One thread at a time. Its destructor waits for those who tell it something at that moment.
@@ -138,6 +140,9 @@ class Watchers : public std::enable_shared_from_this<Watchers> {
   // Whether somebody whose filter lets such an event through has room for it: asked before it is made. Where none has, it
   // counts as lost to them.
   [[nodiscard]] bool want(const ReportingProgram& program, EventKind kind);
+  // Events of one program, `count` of them (those beyond `kinds` have none), before want() is asked for each: true where no
+  // watcher of that program's events has room. They count as lost then to those whose filter lets them through.
+  [[nodiscard]] bool loseAll(const ReportingProgram& program, std::span<const EventKind> kinds, size_t count);
   // `body`: of its post, until all events of that are told; null: nobody gets one.
   void tell(PassedEvent event, ToldBody* body = nullptr);
 
@@ -150,7 +155,10 @@ class Watchers : public std::enable_shared_from_this<Watchers> {
     std::atomic<Ring*> ring{nullptr};
     std::atomic<uint32_t> tellers{0};  // that may be using it
   };
-  // Calls `use` with each ring, and its place, whose filter lets it through, which is not taken away meanwhile.
+  // Calls `use` with each ring, and its place, whose filter lets the program through, which is not taken away meanwhile.
+  template <typename Use>
+  void forEachRing(const ReportingProgram& program, Use use);
+  // … whose filter lets the event through.
   template <typename Use>
   void forEachRing(const ReportingProgram& program, EventKind kind, Use use);
   [[nodiscard]] bool wantsBodies() const { return wantingBodies_.load(std::memory_order_relaxed) != 0; }

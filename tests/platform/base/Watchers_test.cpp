@@ -98,6 +98,47 @@ TEST_F(WatchersTest, WantAnEventWhereOneOfThemHasRoomAndLoseItOtherwise) {
   EXPECT_EQ(full->takeLost() + quick->takeLost(), 0U);
 }
 
+TEST_F(WatchersTest, LoseAllEventsOfAPostAtOnceWhereNobodyHasRoom) {
+  const ReportingProgram a{1000, 7, "a", "s"}, b{1000, 7, "b", "s"};
+  const std::vector<EventKind> kinds = {{5, 1}, {6, 1}, {6, 2}};
+  EXPECT_TRUE(watchers_->loseAll(a, kinds, 3)) << "nobody watches";
+  const auto all = watchers_->watch({}), ofB = watchers_->watch({.client = "b"}),
+             six = watchers_->watch({.category = 6});
+  EXPECT_FALSE(watchers_->loseAll(a, kinds, 3));
+  for (size_t i = 0; i < Limits::maxWatchedEvents; ++i) watchers_->tell(event(6));
+  EXPECT_EQ(all->takeLost() + six->takeLost(), 0U);
+  EXPECT_TRUE(watchers_->loseAll(a, kinds, 4)) << "who has room asked for another program";
+  EXPECT_EQ(all->takeLost(), 4U);
+  EXPECT_EQ(six->takeLost(), 2U);
+  EXPECT_EQ(ofB->takeLost(), 0U);
+  EXPECT_FALSE(watchers_->loseAll(b, kinds, 3)) << "who asked for it has room";
+  EXPECT_EQ(all->takeLost() + six->takeLost() + ofB->takeLost(), 0U) << "each is asked for by itself then";
+  EXPECT_NE(six->next(), nullptr);
+  EXPECT_FALSE(watchers_->loseAll(a, kinds, 3)) << "it has read one";
+}
+
+TEST_F(WatchersTest, AreToldOfAPostByProgramAndKindHoweverItsEventsAlternate) {
+  Books books;
+  Counters counters;
+  const auto watcher = books.watchers()->watch({});
+  const auto a = books.open({1000, 7, "a", "s"}, "httppost", false);
+  const auto b = books.open({1000, 7, "b", "s"}, "httppost", false);
+  BookedEvents events;
+  for (const auto& tally : {a, a, b, a}) {
+    tally->take();
+    events.add(tally.get());
+  }
+  events.add(nullptr);
+  b->take();
+  events.add(b.get());
+  events.show({books.watchers(), "httppost", "", {{1, 1}, {2, 1}, {3, 1}, {4, 1}, {5, 1}}, nullptr});
+  PostedEvents(std::move(events), counters).delivered();
+  std::string told;
+  while (const auto event = watcher->next())
+    told += event->program.clientName + std::to_string(event->kind.category) + " ";
+  EXPECT_EQ(told, "a1 a2 b3 a4 b-1 ");
+}
+
 TEST_F(WatchersTest, KnowProgramsByNamesThatAreLongerThanTheBooksKeep) {
   const std::string name(Limits::maxBookNameBytes + 9, 'n');
   const auto watcher = watchers_->watch({.client = std::string(cutName(name))});
