@@ -8,8 +8,9 @@
 
 namespace kyt {
 
-// What a thread waits for: others that hold a lock, or anything else.
-enum class BlockingKind : uint8_t { inLine, other };
+// What a thread waits for: others that hold a lock, or anything else. One that computes for long waits for nothing: whoever
+// counts on the thread for what is urgent is told, and its processor is not given to another.
+enum class BlockingKind : uint8_t { inLine, other, computing };
 
 // Who is told when its thread is about to wait. Nested waits are told once.
 class BlockingObserver {

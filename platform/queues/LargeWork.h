@@ -1,6 +1,7 @@
-// Work that takes a processor for long and much memory meanwhile: a large batch's text and its compression. More at a time
-// than there are processors would finish no sooner, hold all their memory at once, and keep small work waiting for a
-// processor. Users take turns (FairLock.h).
+// Work that takes a processor for long and much memory meanwhile: a large batch's text and its compression. Of the queues
+// that may run at once in a worker pool it leaves one to small work: where large work has all processors, or more threads
+// want one than there are, small work waits for the scheduler's next tick at each of its steps. Users take turns
+// (FairLock.h).
 //
 // Any thread. Who holds a scope waits for nobody who needs one.
 #pragma once
@@ -15,13 +16,13 @@ namespace kyt {
 
 class LargeWork {
  public:
-  // As many at a time as there are processors, and as queues may run in a worker pool: two at least.
-  LargeWork() : LargeWork(std::max(2u, std::thread::hardware_concurrency())) {}
+  // One less at a time than queues may run in a worker pool (which are two at least).
+  LargeWork() : LargeWork(std::max(2u, std::thread::hardware_concurrency()) - 1) {}
   explicit LargeWork(unsigned atOnce) : lock_(atOnce) {}
   LargeWork(const LargeWork&) = delete;
   LargeWork& operator=(const LargeWork&) = delete;
 
-  // Waits in line, then tells the worker pool that its thread is gone for long, until it is destroyed.
+  // Waits in line, then tells whoever counts on its thread that it computes for long, until it is destroyed.
   class Scope {
    public:
     explicit Scope(LargeWork& work) : place_(work.lock_) {}
@@ -39,7 +40,7 @@ class LargeWork {
     };
 
     Place place_;
-    BlockingScope blocking_;
+    BlockingScope blocking_{BlockingKind::computing};
   };
 
  private:

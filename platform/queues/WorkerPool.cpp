@@ -42,6 +42,7 @@ struct WorkerPool::Worker final : BlockingObserver {
   bool inLine = false;  // for a lock that others' queues hold
   // Its own thread's.
   const SerialQueue* queue = nullptr;  // what it runs
+  bool computes = false;               // its scope leaves it its processor
 
   void willBlock(BlockingKind kind) override;
   void hasBlocked() override;
@@ -454,10 +455,11 @@ WorkerPoolFigures WorkerPool::figures() const {
 }
 
 void WorkerPool::Worker::willBlock(BlockingKind kind) {
-  pool->block(*this, kind == BlockingKind::inLine);
+  computes = kind == BlockingKind::computing;
+  if (!computes) pool->block(*this, kind == BlockingKind::inLine);
 }
 void WorkerPool::Worker::hasBlocked() {
-  pool->unblock(*this);
+  if (!computes) pool->unblock(*this);
 }
 
 }  // namespace kyt

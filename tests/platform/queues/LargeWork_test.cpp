@@ -59,6 +59,53 @@ TEST(LargeWork, TwoPlacesThatComeFreeAtOnceAreBothTaken) {
   }
 }
 
+// It computes: its worker's processor is given to nobody else, so that no more threads want one than there are.
+TEST(LargeWork, KeepsItsWorkersPlaceInThePoolAndLeavesOneToSmallWork) {
+  WorkerPoolOptions options;
+  options.runnable = 3;
+  WorkerPool pool(options);
+  LargeWork work(2);
+  std::atomic<int> inside{0}, small{0};
+  std::atomic<bool> goOn{false};
+  const auto wantsMuch = [&] {
+    SerialQueue::create("test.large", pool, 1000)->async([&] {
+      const LargeWork::Scope scope(work);
+      ++inside;
+      EXPECT_TRUE(eventually([&] { return goOn.load(); }));
+      --inside;
+    });
+  };
+  for (int i = 0; i < 4; ++i) wantsMuch();
+  EXPECT_TRUE(eventually([&] { return inside == 2 && pool.figures().blocked == 2; }))
+      << "two have places, two stand in line: " << pool.figures().blocked;
+  // Of the three that may run two compute; those in line are counted out.
+  for (int i = 0; i < 20; ++i) SerialQueue::create("test.small", pool, 2000)->async([&] { ++small; });
+  EXPECT_TRUE(eventually([&] { return small == 20; }));
+  EXPECT_EQ(inside, 2);
+  EXPECT_EQ(pool.figures().workers, 5u) << "no worker more than those in line, those inside, and one";
+  goOn = true;
+  EXPECT_TRUE(eventually([&] { return pool.figures().idle == pool.figures().workers; }));
+  pool.shutDown();
+}
+
+TEST(LargeWork, HasOnePlaceLessThanQueuesMayRun) {
+  LargeWork work;
+  const size_t most = std::max(2u, std::thread::hardware_concurrency()) - 1;
+  std::vector<std::unique_ptr<LargeWork::Scope>> all;
+  for (size_t i = 0; i < most; ++i) all.push_back(std::make_unique<LargeWork::Scope>(work));
+  std::atomic<bool> isIn{false};
+  WorkerPool pool(WorkerPoolOptions{});
+  SerialQueue::create("test.large", pool)->async([&] {
+    const LargeWork::Scope scope(work);
+    isIn = true;
+  });
+  EXPECT_TRUE(eventually([&] { return pool.figures().blocked == 1; })) << "it stands in line";
+  EXPECT_FALSE(isIn);
+  all.pop_back();
+  EXPECT_TRUE(eventually([&] { return isIn.load(); }));
+  pool.shutDown();
+}
+
 // However many batches of one user stand in line, another's is next.
 TEST(LargeWork, UsersTakeTurns) {
   LargeWork work(1);
