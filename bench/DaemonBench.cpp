@@ -15,7 +15,8 @@ int main(int argc, char** argv) {
   const std::vector<std::pair<std::string, void (*)(const Surroundings&)>> groups = {
       {"posting", measurePosting}, {"fields", measureFields}, {"quiet", measureQuiet},
       {"tls", measureTLS},         {"busy", measureBusy},     {"batching", measureBatching},
-      {"client", measureClient},   {"idle", measureIdle},     {"beside", measureBeside}};
+      {"client", measureClient},   {"idle", measureIdle},     {"end", measureEnd},
+      {"beside", measureBeside}};
   std::vector<std::string> names;
   for (const auto& group : groups) names.push_back(group.first);
   CLI::App app("Benchmarks of the whole daemon.", "kyt_bench_daemon");

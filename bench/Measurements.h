@@ -29,6 +29,7 @@ void measureBusy(const Surroundings& surroundings);
 void measureBatching(const Surroundings& surroundings);
 void measureClient(const Surroundings& surroundings);
 void measureIdle(const Surroundings& surroundings);
+void measureEnd(const Surroundings& surroundings);
 void measureBeside(const Surroundings& surroundings);
 
 }  // namespace kyt::bench

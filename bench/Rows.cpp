@@ -24,6 +24,7 @@ std::vector<RowName> makeRows() {
   for (const char* what : {rows::kWakeUps, rows::kIdleAnonymous, rows::kIdleResident, rows::kAfterFirst,
                            rows::kIdleSession, rows::kCrowd})
     made.push_back({"idle", what});
+  made.push_back({"end", rows::kEnd});
   for (const char* what : {rows::kOutboxOn, rows::kDeafWatcher}) made.push_back({"beside", what});
   return made;
 }

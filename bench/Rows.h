@@ -52,6 +52,7 @@ inline constexpr char kIdleAnonymous[] = "idle daemon: anonymous memory";
 inline constexpr char kIdleResident[] = "idle daemon: resident before the first session";
 inline constexpr char kAfterFirst[] = "resident after the first session";
 inline constexpr char kIdleSession[] = "an idle configured session, growth";
+inline constexpr char kEnd[] = "the daemon's end, with half as many sessions again as in the idle rows";
 inline constexpr char kOutboxOn[] = "the outbox on, with a server that answers";
 inline constexpr char kDeafWatcher[] = "a watcher that reads nothing";
 inline constexpr char kCrowd[] = "many sessions of which 10 speak";

@@ -136,4 +136,22 @@ void measureIdle(const Surroundings& surroundings) {
   measureCrowd(surroundings, *stand, peers);
 }
 
+// Each session is told before the daemon ends, and has something to post.
+void measureEnd(const Surroundings& surroundings) {
+  const auto stand = standFor(surroundings);
+  if (stand == nullptr) return;
+  const std::vector<std::string> calls = eventCalls(ordinaryPayloads(kCorpus));
+  const size_t wanted = surroundings.sizes.sessions + surroundings.sizes.sessions / 2;
+  std::vector<Peer> peers;
+  stand->openSessions(peers, wanted);
+  for (size_t i = 0; i < peers.size(); ++i)
+    if (!peers[i].sendAndPing(calls[i % calls.size()])) return;
+  const std::optional<double> seconds = stand->end();
+  const uint64_t posts = stand->sink().posts();
+  printRow(rows::kEnd, seconds ? text("%.2f s", *seconds) : "NOT ENDED",
+           text("%zu sessions, of which %llu posted", peers.size(), static_cast<unsigned long long>(posts)),
+           "within the grace time, 5 s",
+           seconds && *seconds <= 5 && peers.size() == wanted && posts == wanted);
+}
+
 }  // namespace kyt::bench

@@ -130,4 +130,10 @@ Stand::Run Stand::post(const std::vector<std::string>& calls, const Load& load) 
   return run;
 }
 
+std::optional<double> Stand::end() {
+  const auto begin = Steady::now();
+  if (stage_->stopDaemon(std::chrono::minutes(1)) != 0) return std::nullopt;
+  return std::chrono::duration<double>(Steady::now() - begin).count();
+}
+
 }  // namespace kyt::bench

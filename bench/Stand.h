@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -53,6 +54,8 @@ class Stand {
   static void send(Peer& peer, const std::vector<std::string>& calls, size_t count, size_t perWrite);
   // As many more as are missing; fewer when the daemon refuses one.
   void openSessions(std::vector<Peer>& peers, size_t wanted) const;
+  // SIGTERM; seconds until the daemon has ended with status 0, none after a minute or with another.
+  [[nodiscard]] std::optional<double> end();
   [[nodiscard]] int pid() { return stage_->daemon()->pid(); }
   [[nodiscard]] const std::string& folder() const { return stage_->folder(); }
   [[nodiscard]] std::string socketPath() const { return stage_->socketPath(); }
