@@ -47,6 +47,9 @@ struct Limits {
   // Seconds for the log to acknowledge: with spoolTime after it a post is answered before its front gives it up, which is
   // after 10 where docs/FLEET.md is followed.
   static constexpr double maxPublishSeconds = 4;
+  // After a change of the spool failed, a receiver without a log is not ready for so long. Then a post may try the disk:
+  // where nobody sends any, none would ever show that the disk is well again.
+  static constexpr std::chrono::seconds brokenTime{10};
   // Between attempts to open the spool of a disk that is broken.
   static constexpr std::chrono::seconds reopenPause{5};
   // Bytes of a header that a message carries on; what is longer is cut.

@@ -133,7 +133,7 @@ const char* MetricsHandler::unreadiness() const {
   if (!isOpen_) return "the port of posts is not open";
   if (!sources_.delivery.wasUp()) return "the log has not been there yet";
   if (sources_.spool.bytes() >= sources_.spool.maxBytes() / 10 * 9) return "the spool is nearly full";
-  if (sources_.spool.isBroken() && !sources_.delivery.takesMessages())
+  if (!sources_.spool.mayKeep() && !sources_.delivery.takesMessages())
     return "neither log nor spool takes posts";
   return nullptr;
 }

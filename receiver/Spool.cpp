@@ -85,6 +85,10 @@ void Spool::tick() {
   for (const auto& done : late) done(SpoolVerdict::broken);
 }
 
+bool Spool::mayKeep() const {
+  return !isBroken() || (isOpen_ && failedAt_.load() + Limits::brokenTime <= clock_.monotonic());
+}
+
 uint64_t Spool::oldestSeconds() const {
   const int64_t oldest = oldest_.load();
   return oldest == 0 ? 0 : static_cast<uint64_t>(std::max<int64_t>(clock_.timeOfDay().seconds - oldest, 1));

@@ -79,9 +79,10 @@ class Spool {
   [[nodiscard]] bool hasReplays(uint32_t partition) const { return lanes_.at(partition).isReplayable.load(); }
   [[nodiscard]] uint32_t partitions() const { return static_cast<uint32_t>(lanes_.size()); }
   [[nodiscard]] uint64_t damagedFiles() const { return store_.filesAside(); }  // that lie beside it
-  [[nodiscard]] bool isBroken() const {
-    return isBroken_.load();
-  }  // the last change failed, or it is not open
+  // The last change failed, or it is not open.
+  [[nodiscard]] bool isBroken() const { return isBroken_.load(); }
+  // Whether a post may be kept, or may try: false for Limits::brokenTime after a change failed, and while it is not open.
+  [[nodiscard]] bool mayKeep() const;
 
  private:
   struct Adding {
@@ -137,14 +138,14 @@ class Spool {
   Log& lines_;
   std::atomic<uint64_t> posts_{0}, bytes_{0};
   std::atomic<int64_t> oldest_{0};
-  std::atomic<bool> isBroken_{false};
+  std::atomic<bool> isBroken_{false}, isOpen_{false};
+  std::atomic<MonotonicTime> failedAt_{MonotonicTime{}};  // the last change that did
 
   std::vector<Lane> lanes_;  // by partition
 
   const std::function<std::optional<std::string>()> prepare_;
 
   // The spool's thread alone.
-  bool isOpen_ = false;
   MonotonicTime nextOpening_{};
   std::map<int64_t, Entry> entries_;          // but for those that are stuck
   uint64_t stuckPosts_ = 0, stuckBytes_ = 0;  // that the log never takes, or the disk does not give

@@ -106,6 +106,7 @@ bool Spool::change(const Additions& added) {
   for (const StoredPost& post : posts) pointers.push_back(&post);
   const auto wrong = store_.change(pointers, toRemove_, false);
   if (wrong) {
+    failedAt_ = clock_.monotonic();
     const bool isNew = !isBroken_.exchange(true);
     if (wrong->kind == PostStoreProblem::Kind::damaged) {
       setAside(wrong->text);

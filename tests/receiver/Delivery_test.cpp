@@ -10,6 +10,7 @@
 #include "platform/fake/ManualClock.h"
 #include "platform/fake/MemoryLogSink.h"
 #include "receiver/Limits.h"
+#include "receiver/Metrics.h"
 #include "tests/receiver/FakeLog.h"
 
 namespace kyt::receiver {
@@ -176,6 +177,36 @@ TEST_F(DeliveryTest, ABrokenDiskRefusesAndTheLogIsTriedAgainWithoutASpool) {
   log_.setMood(Mood::stores);
   pass(Limits::retryPause);
   EXPECT_EQ(*take("b"), Fate::stored);
+}
+
+// Where a balancer asks, no post comes to a receiver that is not ready: it would never learn that its disk is well again.
+TEST_F(DeliveryTest, AFailureOfTheDiskKeepsPostsAwayForAWhileAlone) {
+  MetricsSources sources{figures_, delivery_, spool_};
+  MetricsHandler handler(sources);
+  handler.open();
+  EXPECT_EQ(handler.unreadiness(), nullptr);
+  delivery_.logIsUp(false);
+  disk_->problem = {PostStoreProblem::Kind::unavailable, "disk full"};
+  const auto refused = take("a");
+  turn();
+  EXPECT_EQ(*refused, Fate::spoolBroken);
+  ASSERT_NE(handler.unreadiness(), nullptr);
+  EXPECT_STREQ(handler.unreadiness(), "neither log nor spool takes posts");
+  pass(Limits::brokenTime - std::chrono::milliseconds(1));
+  EXPECT_NE(handler.unreadiness(), nullptr);
+  pass(std::chrono::milliseconds(1));
+  EXPECT_EQ(handler.unreadiness(), nullptr) << "the next may try";
+  const auto again = take("b");
+  turn();
+  EXPECT_EQ(*again, Fate::spoolBroken);
+  EXPECT_NE(handler.unreadiness(), nullptr);
+  pass(Limits::brokenTime);
+  disk_->problem.reset();
+  const auto kept = take("c");
+  turn();
+  EXPECT_EQ(*kept, Fate::spooled);
+  pass(std::chrono::milliseconds(1));
+  EXPECT_EQ(handler.unreadiness(), nullptr);
 }
 
 TEST_F(DeliveryTest, WhoWaitsTooLongForTheDiskIsRefused) {
