@@ -9,6 +9,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/queues/FairLock.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/WorkerPool.h"
 #include "tests/support/Eventually.h"
@@ -56,6 +57,40 @@ TEST(LargeWork, TwoPlacesThatComeFreeAtOnceAreBothTaken) {
     ASSERT_TRUE(eventually([&] { return waiting == 2; }));
     first.reset();
     second.reset();
+  }
+}
+
+// Of two places the first is left to whoever takes it, upon which the first in line is woken; the second, when the slice is
+// over, is passed to that very one, who has not run yet. Whether it hits the moment is the scheduler's choice: each round
+// tries it, and whatever happens both who wait must get a place.
+TEST(LargeWork, APlaceIsTakenThoughWhoWasWokenForItIsPassedAnother) {
+  constexpr auto kSlice = std::chrono::milliseconds(1);
+  for (int round = 0; round < 100; ++round) {
+    FairLock lock(2);
+    lock.take();
+    lock.take();
+    std::atomic<int> inside{0};
+    WorkerPoolOptions options;
+    options.runnable = 4;
+    WorkerPool pool(options);
+    for (int i = 0; i < 3; ++i)
+      SerialQueue::create("test.large", pool)->async([&] {
+        lock.take();
+        ++inside;
+      });
+    ASSERT_TRUE(eventually([&] { return pool.figures().blocked == 3; }));
+    const auto until = [begin = std::chrono::steady_clock::now()](std::chrono::microseconds time) {
+      while (std::chrono::steady_clock::now() - begin < time) continue;
+    };
+    lock.giveBack();  // passed to the first, whose slice begins
+    until(kSlice - std::chrono::microseconds(10));
+    lock.giveBack();
+    until(kSlice + std::chrono::microseconds(10));
+    lock.giveBack();
+    // Nobody gives back any more.
+    EXPECT_TRUE(eventually([&] { return inside == 3; })) << "a place stays empty though somebody waits";
+    if (inside != 3) lock.giveBack();
+    pool.shutDown();
   }
 }
 
