@@ -83,6 +83,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   // The longest between two looks at age and consent, and after a disk's failure.
   static constexpr std::chrono::minutes kLongestRest{30};
   static constexpr std::chrono::seconds kDiskPause{30};
+  // A network that comes and goes makes no server be asked more often than this.
+  static constexpr std::chrono::seconds kBetweenTries{5};
   static constexpr unsigned kMostAtATime = 4;  // to one server that takes them
 
   [[nodiscard]] static std::shared_ptr<Outbox> create(Ports ports, OutboxSettings settings);
