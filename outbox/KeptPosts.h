@@ -45,7 +45,8 @@ struct ServerLine {
   bool isPrompt = false;       // its last request did not take long
   int lastStatus = 0;          // 0: none yet, or no answer came
   MonotonicTime nextTry{}, lastTry{};
-  MonotonicTime notBefore{};  // says the server
+  MonotonicTime notBefore{};  // says the server; none: it has not, or nobody heeds it any more
+  MonotonicTime noted{};      // the disk knows it for so long; none: it does not
   bool isHastened = false;    // the next try is sooner since the server took a new post
   unsigned hastened = 0;      // such tries that failed, in a row
   size_t inFlight = 0;

@@ -174,15 +174,20 @@ void Outbox::turn() {
     takeTime();
     forgetTooOld();
     // By itself, so that a log that cannot be cut short says nothing of what is new.
-    if (removesForGood_) commit(Plan());
+    if (removesForGood_) {
+      notePauses();
+      commit(Plan());
+    }
   }
   keepAll(std::move(inbox.posts));
   turnIsOver(inbox);
   takeNews(inbox);
+  notePauses();
   if (posts_.size() == 0 && isLoaded_) {
     books_.dropRest(Reason::outboxUnreadable);  // of posts that were not what had been kept
     if (removed_.empty() && size_.load(std::memory_order_relaxed) != 0) {
       ports_.store.becameEmpty();
+      forgetNoted();
       isConsentNoted_ = false;
     }
   }

@@ -192,6 +192,9 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   void fail(ServerLine& line, std::optional<Duration> pause, bool isUnanswered) REQUIRES(*queue_);
   void failAgain(KeptPosts::Entry& entry, const Answer& answer) REQUIRES(*queue_);
   void pause(ServerLine& line, Duration length) REQUIRES(*queue_);
+  void takePauses(bool isBelieved = false) REQUIRES(*queue_);
+  void notePauses() REQUIRES(*queue_);
+  void forgetNoted() REQUIRES(*queue_);
   // Not before the time that the server has asked for.
   static void setNextTry(ServerLine& line, MonotonicTime time);
   // False: it has no effect.
@@ -265,7 +268,7 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   int64_t last_ GUARDED_BY(*queue_) = 0, lastLoaded_ GUARDED_BY(*queue_) = 0;
   uint64_t diskWork_ GUARDED_BY(*queue_) = 0;      // what the disk has done well
   unsigned unreadInARow_ GUARDED_BY(*queue_) = 0;  // posts that it did not give
-  MonotonicTime readingRestsUntil_ GUARDED_BY(*queue_){};
+  MonotonicTime readingRestsUntil_ GUARDED_BY(*queue_){}, notingRestsUntil_ GUARDED_BY(*queue_){};
   bool isLoaded_ GUARDED_BY(*queue_) = false, isWatching_ GUARDED_BY(*queue_) = false;
   bool isClosed_ GUARDED_BY(*queue_) = false, wasConsentGiven_ GUARDED_BY(*queue_) = true;
   uint64_t consentEpoch_ GUARDED_BY(*queue_) = 0;  // of the last look
@@ -274,6 +277,8 @@ class Outbox final : public std::enable_shared_from_this<Outbox> {
   int64_t oldestBorn_ GUARDED_BY(*queue_) = std::numeric_limits<int64_t>::max();  // none is older
   int64_t loadedAt_ GUARDED_BY(*queue_) = 0, nextAgeLook_ GUARDED_BY(*queue_) = 0;
   int64_t nextSetAsideLook_ GUARDED_BY(*queue_) = 0;
+  int64_t pausesAheadUntil_ GUARDED_BY(*queue_) =
+      0;  // since 1970: then the clock is behind them no more; 0: none is
   int64_t untimed_ GUARDED_BY(*queue_) =
       0;  // the last post of which the clock has not said when it was kept; 0: none
   bool hasAgesToTake_ GUARDED_BY(*queue_) =

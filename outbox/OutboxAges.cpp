@@ -57,7 +57,14 @@ void Outbox::takeAges() {
 void Outbox::takeTime() {
   const auto now = timeNow();
   if (!now || diskRests()) return;
-  if (std::exchange(hasAgesToTake_, false)) takeAges();
+  if (std::exchange(hasAgesToTake_, false)) {
+    takeAges();
+    takePauses();
+  }
+  if (pausesAheadUntil_ != 0 && (*now >= pausesAheadUntil_ || seconds() - loadedAt_ >= kBelievedAfter)) {
+    pausesAheadUntil_ = 0;
+    takePauses(true);
+  }
   if (untimed_ == 0) return;
   if (const auto problem = ports_.store.setLatest(untimed_, *now)) return handle(*problem);
   untimed_ = 0;

@@ -95,7 +95,8 @@ void Outbox::takeNews(const Inbox& inbox) {
   if (!inbox.connectivityChanged && !inbox.flush) return;
   for (auto& [server, line] : posts_.lines()) {
     if (inbox.flush) {
-      line.nextTry = line.notBefore = now;
+      line.nextTry = now;
+      line.notBefore = MonotonicTime();
       KeptPosts::comeBack(line, true);
     } else if (line.isUnreachable) {
       hasten(line, kBetweenTries);

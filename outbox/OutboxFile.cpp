@@ -48,6 +48,7 @@ void Outbox::load() {
   if (problem) return handle(*problem);
   forgetUnreadable(unreadable);
   lastLoaded_ = last_;
+  takePauses();
   if (oldestBorn_ >= loadedAt_ - static_cast<int64_t>(settings_.maxAgeSeconds)) doubtNoAges();
   if (posts_.size() == 0) return;
   ports_.log.normal("Outbox: %zu posts of %llu bytes are left from before", posts_.size(),
@@ -94,7 +95,7 @@ void Outbox::commit(Plan plan) {
   ++diskWork_;
   removed_.clear();
   if (removesForGood_ && posts_.byConsent() == 0) isConsentNoted_ = false;  // the file may be gone
-  removesForGood_ = false;
+  if (std::exchange(removesForGood_, false) && posts_.size() == 0) forgetNoted();
   kept(plan);
 }
 
@@ -142,6 +143,7 @@ void Outbox::handle(const PostStoreProblem& problem) {
     if (!wasConsentGiven_)
       mustRemoveSetAside_ = !ports_.store.removeSetAside(std::numeric_limits<int64_t>::max());
     isConsentNoted_ = false;
+    forgetNoted();
     return;
   }
   {

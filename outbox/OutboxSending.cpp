@@ -128,7 +128,8 @@ void Outbox::setTimer() {
   } else if (!isStopping_) {
     for (const auto& [server, line] : posts_.lines())
       if (line.posts != 0 && line.inFlight == 0 && line.nextTry > now) next = std::min(next, line.nextTry);
-    if (readingRestsUntil_ > now) next = std::min(next, readingRestsUntil_);
+    for (const MonotonicTime until : {readingRestsUntil_, notingRestsUntil_})
+      if (until > now) next = std::min(next, until);
   }
   timer_ =
       ports_.timers.after(std::max<Duration>(next - now, Duration(0)), queue_, [weak = weak_from_this()] {

@@ -76,6 +76,16 @@ class PostStore {
   enum class Note : int64_t { consentEpoch = 1, tooOldSince = 2 };
   [[nodiscard]] virtual int64_t note(Note name) = 0;
   [[nodiscard]] virtual std::optional<PostStoreProblem> setNote(Note name, int64_t value) = 0;
+  // How long servers want to be left alone, each under a number that stands for its name, in seconds since 1970.
+  struct ServerPause {
+    uint64_t server = 0;
+    int64_t since = 0, until = 0;  // when that was noted; 0: none any more
+  };
+  // As they lie there, Limits::maxOutboxPauses at most: a damaged file may say anything.
+  [[nodiscard]] virtual std::vector<ServerPause> pauses() = 0;
+  // All of them, in place of what was there of these servers, or none. A store that is not there is made by those with an end
+  // alone.
+  [[nodiscard]] virtual std::optional<PostStoreProblem> setPauses(std::span<const ServerPause> pauses) = 0;
   // Nothing is left in it: it may give its room back to the disk.
   virtual void becameEmpty() = 0;
   // What is there is put beside, for a person to look at, and the next change begins anew. Its text: what was done.

@@ -28,6 +28,9 @@ class FakePostStore : public PostStore {
     bool keepsSetAside = false;
     int64_t setAsideAt = 0;  // seconds since 1970
     std::map<Note, int64_t> notes;
+    std::map<uint64_t, ServerPause> pauses;
+    std::optional<PostStoreProblem> problemOfPauses;  // what setting them meets
+    size_t pausesSet = 0;                             // changes
   };
   explicit FakePostStore(std::shared_ptr<Disk> disk) : disk_(std::move(disk)) {}
 
@@ -62,11 +65,15 @@ class FakePostStore : public PostStore {
     if (known == disk_->posts.end()) return PostStoreProblem{PostStoreProblem::Kind::post, "missing"};
     return known->second;
   }
-  void becameEmpty() override { disk_->notes.clear(); }
+  void becameEmpty() override {
+    disk_->notes.clear();
+    disk_->pauses.clear();
+  }
   [[nodiscard]] std::string setAside() override {
     ++disk_->setAside;
     disk_->isSetAside = true;
     disk_->posts.clear();
+    disk_->pauses.clear();
     disk_->problem.reset();
     return "set aside";
   }
@@ -86,6 +93,21 @@ class FakePostStore : public PostStore {
   [[nodiscard]] std::optional<PostStoreProblem> setNote(Note name, int64_t value) override {
     if (disk_->problem) return disk_->problem;
     disk_->notes[name] = value;
+    return std::nullopt;
+  }
+  [[nodiscard]] std::vector<ServerPause> pauses() override {
+    std::vector<ServerPause> all;
+    for (const auto& [server, pause] : disk_->pauses) all.push_back(pause);
+    return disk_->problem ? std::vector<ServerPause>() : all;
+  }
+  [[nodiscard]] std::optional<PostStoreProblem> setPauses(std::span<const ServerPause> pauses) override {
+    if (disk_->problem) return disk_->problem;
+    if (disk_->problemOfPauses) return disk_->problemOfPauses;
+    ++disk_->pausesSet;
+    for (const ServerPause& pause : pauses) {
+      disk_->pauses.erase(pause.server);
+      if (pause.until != 0) disk_->pauses[pause.server] = pause;
+    }
     return std::nullopt;
   }
   void close() override {}

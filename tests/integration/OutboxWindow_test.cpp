@@ -2,6 +2,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <ctime>
 #include <sstream>
 
 #include "platform/linux/data/RapidJSON.h"
@@ -104,6 +105,24 @@ TEST_F(OutboxWindow, SendsWhenItIsAsked) {
   EXPECT_TRUE(eventually([&] { return waiting() == 0; })) << daemon_.log();
   EXPECT_GE(taken().size(), static_cast<size_t>(before));
   EXPECT_TRUE(has(columns({"outbox", "flush"}), "0 posts, to 0 servers"));
+}
+
+TEST_F(OutboxWindow, LeavesAServerAloneForAsLongAsItAskedThoughTheDaemonIsKilled) {
+  settings(kOn);
+  retryAfter("7200");
+  start();
+  keep(2);
+  const int64_t before = json({"outbox", "show", server()}).integer("nextTry");
+  EXPECT_GT(before, std::time(nullptr) + 7100);
+  kill();
+  clients_.clear();
+  retryAfter("");
+  take(100);
+  start();
+  const int64_t after = json({"outbox", "show", server()}).integer("nextTry");
+  EXPECT_GE(after, before - 1);
+  EXPECT_LE(after, before + 62);
+  EXPECT_TRUE(taken().empty());
 }
 
 TEST_F(OutboxWindow, DropsWhatItIsTold) {

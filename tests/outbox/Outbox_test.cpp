@@ -1,6 +1,7 @@
 #include "outbox/Outbox.h"
 
 #include <algorithm>
+#include <limits>
 #include <set>
 
 #include "platform/base/Limits.h"
@@ -293,6 +294,196 @@ TEST_F(OutboxTest, LeavesAServerAloneThatAsksForItInItsAnswerToANewPost) {
   EXPECT_EQ(sent(), before);
   pass(seconds(10));
   EXPECT_GT(sent(), before);
+}
+
+// Each restart finds the clock further on, or back.
+class OutboxOfABusyServer : public OutboxTest {
+ protected:
+  static constexpr int64_t kNow = 1767225600;
+  // The server asked for that, once.
+  void begin(const std::string& retryAfter) {
+    start();
+    static_cast<void>(post("kept"));
+    answer(last(), 429, {{"Retry-After", retryAfter}});
+    ASSERT_EQ(disk_->posts.size(), 1U);
+  }
+  void restartAt(int64_t time) {
+    stop();
+    test_.clock.setTimeOfDay({time, 0});
+    start();
+  }
+  // Of the one server's line: until it is asked again.
+  [[nodiscard]] Duration wait() const { return outbox_->list().at(0).untilNextTry; }
+};
+
+TEST_F(OutboxOfABusyServer, IsLeftAloneForAsLongAsItAskedOverARestart) {
+  begin("7200");
+  pass(minutes(10));
+  restart();
+  restart();
+  pass(minutes(109));
+  EXPECT_EQ(sent(), 0U) << "it asked for two hours";
+  pass(minutes(3));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxOfABusyServer, IsAskedAfterARestartThatCameLater) {
+  begin("7200");
+  restartAt(kNow + 7300);
+  pass(seconds(6));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxOfABusyServer, WaitsNoLongerThanItsTimeForAClockThatWasPutBack) {
+  begin("7200");
+  restartAt(kNow - 3LL * 365 * 86400);
+  EXPECT_GE(wait(), hours(2));
+  EXPECT_LE(wait(), hours(2) + minutes(1));
+  pass(minutes(90));
+  restart();
+  EXPECT_LE(wait(), minutes(33)) << "it does not begin anew each time";
+  pass(minutes(29));
+  EXPECT_EQ(sent(), 0U);
+  pass(minutes(5));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxOfABusyServer, IsAskedInTimeThoughTheClockIsBehindAtEachStart) {
+  begin("7200");
+  for (int i = 1; i <= 2; ++i) {
+    restartAt(kNow - 30 * 86400);
+    pass(minutes(1));
+    test_.clock.setTimeOfDay({kNow + i * 1800, 0});
+    pass(minutes(31));
+    EXPECT_LE(wait(), hours(2) - minutes(30 * i + 28));
+    EXPECT_EQ(sent(), 0U);
+  }
+  pass(minutes(31));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxOfABusyServer, WaitsNoLongerThanADayWhateverTheClockSays) {
+  begin("31536000");
+  restartAt(kNow - 86400);
+  EXPECT_EQ(wait(), hours(24));
+  restartAt(kNow + 10);
+  EXPECT_LE(wait(), hours(24));
+}
+
+TEST_F(OutboxOfABusyServer, IsLeftAloneByAClockThatIsNotSetUntilItIs) {
+  begin("7200");
+  restartAt(100);
+  pass(minutes(50));
+  EXPECT_EQ(sent(), 0U);
+  restartAt(200);
+  EXPECT_GE(wait(), hours(2) - minutes(1));
+  test_.clock.setTimeOfDay({kNow + 7100, 0});
+  pass(minutes(30));
+  EXPECT_LE(wait(), minutes(3));
+  pass(minutes(3));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+}
+
+TEST_F(OutboxOfABusyServer, IsAskedOnceTheClockIsSetWhereItsTimeIsOver) {
+  begin("7200");
+  restartAt(100);
+  test_.clock.setTimeOfDay({kNow + 86400, 0});
+  pass(minutes(31));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"kept"}));
+  EXPECT_TRUE(disk_->pauses.empty());
+}
+
+TEST_F(OutboxOfABusyServer, IsLeftAloneThoughTheClockWasSetLater) {
+  test_.clock.setTimeOfDay({100, 0});
+  begin("7200");
+  EXPECT_TRUE(disk_->pauses.empty());
+  test_.clock.setTimeOfDay({kNow, 0});
+  pass(minutes(31));
+  restart();
+  pass(minutes(80));
+  EXPECT_EQ(sent(), 0U);
+}
+
+TEST_F(OutboxOfABusyServer, IsAskedWhereWhatTheDiskSaysCannotBe) {
+  begin("7200");
+  ASSERT_EQ(disk_->pauses.size(), 1U);
+  constexpr int64_t kMost = std::numeric_limits<int64_t>::max(), kLeast = std::numeric_limits<int64_t>::min();
+  const std::pair<int64_t, int64_t> wrong[] = {{kLeast, kMost},
+                                               {kMost, kLeast},
+                                               {0, 0},
+                                               {-1, kNow + 60},
+                                               {kNow, kMost},
+                                               {kMost, kMost},
+                                               {kNow, kNow + 2 * 86400},
+                                               {kNow + 3600, kNow + 60},
+                                               {kMost - 1, kMost}};
+  for (const auto& [since, until] : wrong) {
+    for (auto& [server, pause] : disk_->pauses) pause = {server, since, until};
+    const auto before = disk_->pauses;
+    restart();
+    EXPECT_LE(wait(), seconds(5)) << since << " " << until;
+    stop();
+    disk_->pauses = before;
+    start();
+  }
+  disk_->pauses[77] = {77, kNow, kNow + 3600};
+  restart();
+  EXPECT_FALSE(disk_->pauses.contains(77)) << "of nobody's";
+}
+
+TEST_F(OutboxOfABusyServer, IsLeftAloneNoMoreAfterARestartThatFollowedAFlush) {
+  begin("7200");
+  outbox_->flush();
+  drain();
+  ASSERT_EQ(openBodies().size(), 1U);
+  answer(last(), 503);
+  restart();
+  EXPECT_LE(wait(), seconds(10));
+  EXPECT_TRUE(disk_->pauses.empty());
+}
+
+TEST_F(OutboxOfABusyServer, IsForgottenWithItsLastPost) {
+  begin("7200");
+  EXPECT_EQ(disk_->pauses.size(), 1U);
+  EXPECT_EQ(outbox_->drop({}).posts, 1U);
+  EXPECT_TRUE(disk_->pauses.empty());
+}
+
+TEST_F(OutboxOfABusyServer, CostsTheDiskLittleHoweverOftenItAsks) {
+  start();
+  for (int second = 0; second < 300; ++second) {
+    static_cast<void>(post());
+    answer(last(), 429, {{"Retry-After", "3600"}});
+    pass(seconds(1));
+  }
+  EXPECT_GE(disk_->pausesSet, 4U);
+  EXPECT_LE(disk_->pausesSet, 6U);
+  restart();
+  EXPECT_GE(wait(), seconds(3598));
+}
+
+TEST_F(OutboxOfABusyServer, IsOneOfABoundedNumber) {
+  start();
+  for (size_t i = 0; i < Limits::maxOutboxPauses + 20; ++i) {
+    static_cast<void>(post("x", 1000, "https://busy" + std::to_string(i) + ".example.org"));
+    answer(last(), 429, {{"Retry-After", "3600"}});
+  }
+  EXPECT_EQ(disk_->pauses.size(), Limits::maxOutboxPauses);
+}
+
+TEST_F(OutboxOfABusyServer, KeepsNobodyWaitingWhereTheDiskDoesNotTakeThat) {
+  start();
+  disk_->problemOfPauses = PostStoreProblem{PostStoreProblem::Kind::unavailable, "disk full"};
+  static_cast<void>(post("kept"));
+  answer(last(), 429, {{"Retry-After", "7200"}});
+  postAndKeep("another", 1000, "https://other.example.org/x");
+  pass(seconds(6));
+  EXPECT_EQ(openBodies(), std::vector<std::string>({"another"}));
+  disk_->problemOfPauses.reset();
+  pass(seconds(31));
+  restart();
+  pass(minutes(100));
+  for (const std::string& open : openBodies()) EXPECT_NE(open, "kept");
 }
 
 TEST_F(OutboxTest, LosesOnlyThePostThatAServerRefusesForGood) {

@@ -233,33 +233,6 @@ SQLitePostStore::Problem SQLitePostStore::overwriteFree() {
   return execute("PRAGMA wal_checkpoint(TRUNCATE)");
 }
 
-std::optional<PostStoreProblem> SQLitePostStore::setLatest(int64_t number, int64_t time) {
-  if (Problem wrong = begin()) return wrong;
-  const std::string row = std::to_string(number) + ", " + std::to_string(time);
-  Problem wrong = execute(("BEGIN IMMEDIATE; INSERT OR REPLACE INTO latest VALUES (" + row +
-                           "); DELETE FROM latest WHERE number < (SELECT min(number) FROM posts); COMMIT")
-                              .c_str());
-  if (wrong && sqlite_->isAutoCommit(database_) == 0)
-    static_cast<void>(sqlite_->execute(database_, "ROLLBACK", nullptr, nullptr, nullptr));
-  if (!wrong) latest_[number] = time;
-  return wrong;
-}
-
-int64_t SQLitePostStore::note(Note name) {
-  std::optional<int64_t> value;
-  if (!isThere() || begin() ||
-      query("SELECT value FROM notes WHERE name = ?", value, 0, static_cast<int64_t>(name)))
-    return 0;
-  return value.value_or(0);
-}
-
-std::optional<PostStoreProblem> SQLitePostStore::setNote(Note name, int64_t value) {
-  if (Problem wrong = begin()) return wrong;
-  return execute(("INSERT OR REPLACE INTO notes VALUES (" + std::to_string(static_cast<int64_t>(name)) +
-                  ", " + std::to_string(value) + ")")
-                     .c_str());
-}
-
 void SQLitePostStore::becameEmpty() {
   struct stat status {};
   if (::stat(file_.c_str(), &status) != 0) return;

@@ -16,6 +16,7 @@
 #include <string>
 #include <string_view>
 #include <variant>
+#include <vector>
 
 #include "platform/PostStore.h"
 #include "platform/linux/outbox/SQLiteLibrary.h"
@@ -24,7 +25,7 @@ namespace kyt {
 
 class SQLitePostStore final : public PostStore {
  public:
-  static constexpr int kVersion = 2;
+  static constexpr int kVersion = 3;
   // What setAside() does. Last: the file is "outbox.sqlite.damaged", in place of the one before, and its log is gone. Each: with
   // its log, which has what was kept last, beside those before ("outbox.sqlite.damaged.2" and so on); no byte of them is lost.
   enum class Aside { last, each };
@@ -43,6 +44,8 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] std::optional<PostStoreProblem> setLatest(int64_t number, int64_t time) override;
   [[nodiscard]] int64_t note(Note name) override;
   [[nodiscard]] std::optional<PostStoreProblem> setNote(Note name, int64_t value) override;
+  [[nodiscard]] std::vector<ServerPause> pauses() override;
+  [[nodiscard]] std::optional<PostStoreProblem> setPauses(std::span<const ServerPause> pauses) override;
   void becameEmpty() override;
   [[nodiscard]] std::string setAside() override;
   [[nodiscard]] uint64_t filesAside() const override;
@@ -60,6 +63,7 @@ class SQLitePostStore final : public PostStore {
   [[nodiscard]] Problem checkHeader(int descriptor) const;
   [[nodiscard]] Problem prepareFile();
   [[nodiscard]] Problem checkVersion();
+  [[nodiscard]] Problem takeUp(const char* change);  // a file of an earlier version
   [[nodiscard]] Problem readGone();
   [[nodiscard]] Problem readLatest();
   [[nodiscard]] int64_t timeOf(int64_t number, int64_t keptAt) const;
@@ -75,6 +79,7 @@ class SQLitePostStore final : public PostStore {
   // Past what the disk does not give, to the post before the next one that can be read.
   [[nodiscard]] Problem skipUnreadable(int64_t& after, Function<void(StoredPostHead)>& found);
   [[nodiscard]] Problem execute(const char* sql);
+  [[nodiscard]] Problem executeAsAWhole(const std::string& sql);
   [[nodiscard]] Problem prepare(sqlite3_stmt*& statement, const char* sql);
   [[nodiscard]] Problem add(const StoredPost& post);
   [[nodiscard]] Problem remove(int64_t number);

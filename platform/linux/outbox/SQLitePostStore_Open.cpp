@@ -22,7 +22,7 @@ using Kind = PostStoreProblem::Kind;
 
 constexpr mode_t kMode = 0600;
 constexpr int64_t kApplication = 0x4B595400;  // "KYT" and the version
-constexpr int64_t kVersionBits = 0xFF;
+constexpr int64_t kVersionBits = 0xFF, kSecondVersion = 2;
 constexpr int64_t kGreatestNumber = int64_t{1} << 53;
 // Places at which the disk does not give what lies there; more, and it gives nothing.
 constexpr unsigned kMostSkips = 64;
@@ -33,21 +33,23 @@ constexpr char kBeginning[] =
     "PRAGMA page_size=512; PRAGMA locking_mode=EXCLUSIVE; PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
     "PRAGMA temp_store=MEMORY; PRAGMA cache_size=-256; PRAGMA wal_autocheckpoint=2048;"
     "PRAGMA journal_size_limit=2097152; PRAGMA secure_delete=FAST; PRAGMA trusted_schema=OFF;";
+#define KYT_SINCE_THE_SECOND                                                                         \
+  "CREATE TABLE gone (number INTEGER PRIMARY KEY); CREATE TABLE latest (number INTEGER PRIMARY KEY," \
+  " time INTEGER NOT NULL); CREATE TABLE notes (name INTEGER PRIMARY KEY, value INTEGER NOT NULL);"  \
+  "CREATE TABLE filler (number INTEGER PRIMARY KEY, bytes BLOB NOT NULL);"
+#define KYT_SINCE_THE_THIRD                                                                \
+  "CREATE TABLE IF NOT EXISTS pauses (server INTEGER PRIMARY KEY, since INTEGER NOT NULL," \
+  " until INTEGER NOT NULL); PRAGMA user_version=3; PRAGMA application_id=1264145411; COMMIT;"
 constexpr char kTables[] =
     "BEGIN IMMEDIATE; CREATE TABLE posts (number INTEGER PRIMARY KEY, checksum INTEGER NOT NULL,"
-    " record BLOB NOT NULL, body BLOB NOT NULL, head INTEGER);"
-    "CREATE TABLE gone (number INTEGER PRIMARY KEY); CREATE TABLE latest (number INTEGER PRIMARY KEY,"
-    " time INTEGER NOT NULL); CREATE TABLE notes (name INTEGER PRIMARY KEY, value INTEGER NOT NULL);"
-    "CREATE TABLE filler (number INTEGER PRIMARY KEY, bytes BLOB NOT NULL);"
-    "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
+    " record BLOB NOT NULL, body BLOB NOT NULL, head INTEGER);" KYT_SINCE_THE_SECOND KYT_SINCE_THE_THIRD;
 // Rows of the first version have no checksum of their head: the other one is looked at.
 constexpr char kFromTheFirst[] =
-    "BEGIN IMMEDIATE; ALTER TABLE posts ADD COLUMN head INTEGER;"
-    "CREATE TABLE gone (number INTEGER PRIMARY KEY); CREATE TABLE latest (number INTEGER PRIMARY KEY,"
-    " time INTEGER NOT NULL); CREATE TABLE notes (name INTEGER PRIMARY KEY, value INTEGER NOT NULL);"
-    "CREATE TABLE filler (number INTEGER PRIMARY KEY, bytes BLOB NOT NULL);"
-    "PRAGMA user_version=2; PRAGMA application_id=1264145410; COMMIT;";
-static_assert((kApplication | SQLitePostStore::kVersion) == 1264145410);
+    "BEGIN IMMEDIATE; ALTER TABLE posts ADD COLUMN head INTEGER;" KYT_SINCE_THE_SECOND KYT_SINCE_THE_THIRD;
+constexpr char kFromTheSecond[] = "BEGIN IMMEDIATE;" KYT_SINCE_THE_THIRD;
+#undef KYT_SINCE_THE_SECOND
+#undef KYT_SINCE_THE_THIRD
+static_assert((kApplication | SQLitePostStore::kVersion) == 1264145411);
 
 }  // namespace
 
@@ -165,16 +167,26 @@ SQLitePostStore::Problem SQLitePostStore::prepareFile() {
   return readLatest();
 }
 
+// All of it or nothing, whenever the process is killed.
+SQLitePostStore::Problem SQLitePostStore::takeUp(const char* change) {
+  const int code = sqlite_->execute(database_, change, nullptr, nullptr, nullptr);
+  if (code == SQLITE_OK) return std::nullopt;
+  Problem wrong = problem(code, file_.c_str());
+  if ((code & 0xFF) == SQLITE_ERROR) wrong->kind = Kind::damaged;  // its tables are not those of its version
+  return wrong;
+}
+
 // It stands in the file twice, so that one that is damaged is not taken for a later one.
 SQLitePostStore::Problem SQLitePostStore::checkVersion() {
   std::optional<int64_t> version, application;
   if (Problem wrong = query("PRAGMA user_version", version)) return wrong;
   if (Problem wrong = query("PRAGMA application_id", application)) return wrong;
-  if (version == 1 && application == 0) return execute(kFromTheFirst);
+  if (version == 1 && application == 0) return takeUp(kFromTheFirst);
   const bool isWhole = version && application && (*application & ~kVersionBits) == kApplication &&
-                       (*application & kVersionBits) == *version && *version >= kVersion;
+                       (*application & kVersionBits) == *version && *version >= kSecondVersion;
   if (!isWhole) return PostStoreProblem{Kind::damaged, file_ + ": its version is damaged"};
   if (*version == kVersion) return std::nullopt;
+  if (*version == kSecondVersion) return takeUp(kFromTheSecond);
   return PostStoreProblem{Kind::unavailable, file_ + ": was written by a later version of the daemon"};
 }
 

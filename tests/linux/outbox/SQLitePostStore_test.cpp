@@ -3,10 +3,12 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 
+#include "platform/base/Limits.h"
 #include "platform/linux/outbox/PostRecord.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -303,7 +305,7 @@ TEST_F(SQLitePostStoreTest, LeavesTheFileOfALaterVersionAlone) {
     SQLitePostStore store(folder_.path());
     ASSERT_FALSE(add(store, somePost(1)));
   }
-  execute("PRAGMA user_version=3; PRAGMA application_id=1264145411");
+  execute("PRAGMA user_version=4; PRAGMA application_id=1264145412");
   SQLitePostStore store(folder_.path());
   std::optional<PostStoreProblem> problem;
   EXPECT_TRUE(numbersIn(store, &problem).empty());
@@ -330,6 +332,72 @@ TEST_F(SQLitePostStoreTest, TakesUpAFileOfTheFirstVersion) {
   EXPECT_EQ(numbersIn(store), std::vector<int64_t>({1, 2, 3}));
 }
 
+class SQLitePostStoreOfTheSecondVersion : public SQLitePostStoreTest {
+ protected:
+  SQLitePostStoreOfTheSecondVersion() {
+    {
+      SQLitePostStore store(folder_.path());
+      EXPECT_FALSE(add(store, somePost(1)));
+      EXPECT_FALSE(add(store, somePost(2)));
+      EXPECT_FALSE(store.setNote(PostStore::Note::consentEpoch, 77));
+    }
+    execute("DROP TABLE pauses; PRAGMA user_version=2; PRAGMA application_id=1264145410");
+  }
+  static void expectIsAsItWas(SQLitePostStore& store) {
+    EXPECT_EQ(numbersIn(store), std::vector<int64_t>({1, 2}));
+    auto read = store.read(2);
+    ASSERT_TRUE(std::holds_alternative<StoredPost>(read));
+    expectSame(std::get<StoredPost>(read), somePost(2));
+    EXPECT_EQ(store.note(PostStore::Note::consentEpoch), 77);
+  }
+};
+
+TEST_F(SQLitePostStoreOfTheSecondVersion, IsTakenUp) {
+  for (int i = 0; i < 2; ++i) {
+    SQLitePostStore store(folder_.path());
+    expectIsAsItWas(store);
+    EXPECT_EQ(store.pauses().size(), static_cast<size_t>(i));
+    const PostStore::ServerPause pause{5, 6, 7};
+    EXPECT_FALSE(store.setPauses({&pause, 1}));
+  }
+}
+
+TEST_F(SQLitePostStoreTest, KnowsHowLongServersWantToBeLeftAlone) {
+  const PostStore::ServerPause first{~uint64_t{0}, 1767225600, 1767229200}, second{2, 1767225600, 1767225700};
+  const PostStore::ServerPause longer{2, 1767225601, 1767229999}, none{~uint64_t{0}, 0, 0};
+  {
+    SQLitePostStore store(folder_.path());
+    EXPECT_FALSE(store.setPauses({&none, 1}));
+    EXPECT_TRUE(store.pauses().empty());
+    EXPECT_TRUE(std::filesystem::is_empty(folder_.path())) << "nothing is to be forgotten";
+    ASSERT_FALSE(add(store, somePost(1)));
+    const PostStore::ServerPause both[] = {first, second};
+    EXPECT_FALSE(store.setPauses(both));
+    EXPECT_FALSE(store.setPauses({&longer, 1}));
+  }
+  {
+    SQLitePostStore store(folder_.path());
+    auto found = store.pauses();
+    ASSERT_EQ(found.size(), 2U);
+    std::sort(found.begin(), found.end(), [](const auto& a, const auto& b) { return a.server < b.server; });
+    EXPECT_EQ(found[0].server, 2U);
+    EXPECT_EQ(found[0].since, longer.since);
+    EXPECT_EQ(found[0].until, longer.until);
+    EXPECT_EQ(found[1].server, first.server);
+    EXPECT_EQ(found[1].until, first.until);
+    EXPECT_FALSE(store.setPauses({&none, 1}));
+    EXPECT_EQ(store.pauses().size(), 1U);
+  }
+  std::string rows;
+  for (size_t i = 0; i < 2000; ++i) rows += (i == 0 ? "(" : ", (") + std::to_string(i + 10) + ", 'x', x'00')";
+  execute("INSERT INTO pauses VALUES " + rows);
+  EXPECT_EQ(SQLitePostStore(folder_.path()).pauses().size(), Limits::maxOutboxPauses);
+  execute("DROP TABLE pauses");
+  SQLitePostStore without(folder_.path());
+  EXPECT_TRUE(without.pauses().empty());
+  EXPECT_EQ(numbersIn(without), std::vector<int64_t>({1})) << "that is no matter of the posts";
+}
+
 TEST_F(SQLitePostStoreTest, TellsADamagedFileFromOneThatIsUnavailable) {
   {
     SQLitePostStore store(folder_.path());
@@ -350,17 +418,20 @@ TEST_F(SQLitePostStoreTest, TellsADamagedFileFromOneThatIsUnavailable) {
     bytes[at] = value;
     return bytes;
   };
-  const std::pair<std::string, std::string> cases[] = {{"", ""},
-                                                       {good.substr(0, 60), ""},
-                                                       {with(0, 's'), ""},
-                                                       {with(16, 4), ""},   // the size of its pages
-                                                       {with(18, 9), ""},   // who may write it
-                                                       {with(19, 9), ""},   // who may read it
-                                                       {with(63, 66), ""},  // its version
-                                                       {with(71, 3), ""},   // … where it stands again
-                                                       {good, "PRAGMA user_version=0"},
-                                                       {good, "DROP TABLE posts"},
-                                                       {good, "DROP TABLE gone"}};
+  const std::pair<std::string, std::string> cases[] = {
+      {"", ""},
+      {good.substr(0, 60), ""},
+      {with(0, 's'), ""},
+      {with(16, 4), ""},   // the size of its pages
+      {with(18, 9), ""},   // who may write it
+      {with(19, 9), ""},   // who may read it
+      {with(63, 66), ""},  // its version
+      {with(71, 9), ""},   // … where it stands again
+      {good, "PRAGMA user_version=0"},
+      // … whose tables are there already
+      {good, "PRAGMA user_version=1; PRAGMA application_id=0"},
+      {good, "DROP TABLE posts"},
+      {good, "DROP TABLE gone"}};
   for (const auto& [bytes, sql] : cases) {
     const auto problem = problemOf(bytes, sql);
     ASSERT_TRUE(problem) << &bytes - &cases[0].first << " " << sql;
