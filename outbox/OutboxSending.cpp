@@ -22,13 +22,15 @@ void Outbox::sendWhatIsDue() {
   for (ServerLine* line : due) sendFrom(*line);
 }
 
-// Each silent server holds its place until its time-out: however many there are, they hold up one another alone.
+// Each silent server holds its place until its time-out: however many there are, they hold up one another alone. Those that
+// fall silent only now may all have several on their way: these leave room for one to each of the others.
 bool Outbox::hasPlaceFor(const ServerLine& line) {
   if (inFlight_.size() >= Limits::maxOutboxRequestsInFlight) return false;
-  if (line.isPrompt) return true;
+  if (line.isPrompt && line.inFlight == 0) return true;
   size_t toSlow = 0;
   for (const auto& [number, sending] : inFlight_) toSlow += sending->line->isPrompt ? 0 : 1;
-  return toSlow < Limits::maxOutboxRequestsToSlowServers;
+  return line.isPrompt ? inFlight_.size() - toSlow < Limits::mostOutboxRequestsBesideOthers
+                       : toSlow < Limits::maxOutboxRequestsToSlowServers;
 }
 
 void Outbox::sendFrom(ServerLine& line) {

@@ -116,6 +116,8 @@ struct Limits {
   static constexpr size_t maxOutboxRequestsInFlight = 64;
   static constexpr size_t maxOutboxRequestsToSlowServers = maxOutboxRequestsInFlight / 2;
   static constexpr std::chrono::seconds outboxSlowAnswer{10};
+  // As long as there are fewer than so many to servers that answer soon, more than one goes to one of these.
+  static constexpr size_t mostOutboxRequestsBesideOthers = maxOutboxRequestsInFlight / 2;
   // Servers of which its disk knows that they want to be left alone: each is some 30 bytes there.
   static constexpr size_t maxOutboxPauses = 1024;
   // Different contents of kept posts, by whose events they are and how many, that it knows without reading them: each is

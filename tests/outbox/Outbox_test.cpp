@@ -212,6 +212,24 @@ TEST_F(OutboxTest, KeepsNoServersRepeatsWaitingForServersThatAreSilent) {
   EXPECT_EQ(row().delivered, 2U * 9);
 }
 
+// They took four at a time, until none of them answered any more.
+TEST_F(OutboxTest, KeepsNoServersRepeatsWaitingForManyThatFallSilentAtOnce) {
+  start();
+  constexpr size_t kServers = Limits::maxOutboxRequestsInFlight / Outbox::kMostAtATime;
+  for (size_t i = 0; i < kServers; ++i)
+    for (int number = 0; number < 8; ++number)
+      postAndKeep("silent", 1000, "https://silent" + std::to_string(i) + ".example.org");
+  pass(seconds(6));
+  ASSERT_EQ(openBodies().size(), kServers);
+  const size_t until = sent();
+  for (size_t i = 0; i < until; ++i)
+    if (network_->isOpen(i)) answer(i, 200);
+  EXPECT_GT(openBodies().size(), 2 * kServers) << "more than one goes at a time";
+  postAndKeep("good");
+  pass(seconds(6));
+  EXPECT_EQ(openBodies().back(), "good");
+}
+
 TEST_F(OutboxTest, LetsServersThatAreSilentTakeTurns) {
   start();
   constexpr size_t kServers = 2 * Limits::maxOutboxRequestsToSlowServers;
