@@ -66,7 +66,9 @@ std::optional<Duration> retryAfter(const URLResponse* response, TimeValue now) {
   if (!isNumber) {
     const auto date = secondsOfDate(*text);
     if (!date) return std::nullopt;
-    seconds = *date - now.seconds;
+    // By the server's clock, where it says what that shows: the device's may not be set.
+    const auto shown = secondsOfDate(response->header("Date").value_or(""));
+    seconds = *date - shown.value_or(now.seconds);
   } else if (error == std::errc::result_out_of_range) {
     seconds = kLongestPause.count();
   }

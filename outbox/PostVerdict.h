@@ -22,7 +22,8 @@ enum class PostVerdict : uint8_t {
 // The status that a server has decided on counts even if its reply broke off.
 [[nodiscard]] PostVerdict verdictOf(const URLResponse* response, const Error* error);
 
-// How long the server wants to be left alone, at most a day: "Retry-After" in seconds or as a date of HTTP.
+// How long the server wants to be left alone, at most a day: "Retry-After" in seconds or as a date of HTTP. `now`
+// counts where the answer has no "Date".
 [[nodiscard]] std::optional<Duration> retryAfter(const URLResponse* response, TimeValue now);
 
 // Scheme, host and port of an address, in lower case: what one line of posts is for.

@@ -50,6 +50,16 @@ TEST(PostVerdict, ReadsRetryAfterAsSecondsOrDate) {
   EXPECT_EQ(pauseOf("Sun, 06 Nov 1994 08:00:00 GMT"), seconds(0));
 }
 
+TEST(PostVerdict, ReadsADateByTheServersClockWhereItSaysWhatThatShows) {
+  const auto pauseBy = [](const char* date, int64_t now) {
+    const URLResponse response{503, {{"Date", date}, {"Retry-After", "Sun, 06 Nov 1994 08:50:37 GMT"}}};
+    return retryAfter(&response, {now, 0});
+  };
+  for (const int64_t now : {int64_t{0}, int64_t{100}, int64_t{784111777}, int64_t{4102444800}})
+    EXPECT_EQ(pauseBy("Sun, 06 Nov 1994 08:49:37 GMT", now), seconds(60)) << now;
+  EXPECT_EQ(pauseBy("yesterday", 784111777), seconds(60));
+}
+
 TEST(PostVerdict, WaitsForADayAtMost) {
   for (const char* text : {"31536000", "99999999999999999999999", "Mon, 06 Nov 1995 08:49:37 GMT"})
     EXPECT_EQ(pauseOf(text), seconds(86400)) << text;
