@@ -38,6 +38,7 @@ struct Fault {
   int times = 1;
   int error = EIO;
   bool waitsForNoDisk = false;
+  bool kills = false;  // it does not fail, its process is killed before it
   std::set<off_t>
       bad{};  // places of the file itself, of kPlace bytes, that cannot be read until they are written
   static constexpr off_t kPlace = 512;
@@ -65,6 +66,7 @@ struct Fault {
     if (call != name) return false;
     const long number = seen++;
     if (after < 0 || number < after || number >= after + times) return false;
+    if (kills) ::kill(::getpid(), SIGKILL);
     errno = error;
     return true;
   }
@@ -132,8 +134,8 @@ int failingUnlink(const char* path) {
   return reinterpret_cast<int (*)(const char*)>(real("unlink"))(path);
 }
 
-constexpr const char* kCalls[] = {"open",  "pwrite64", "pread64",   "ftruncate",
-                                  "fstat", "unlink",   "fdatasync", "fsync"};
+constexpr const char* kCalls[] = {"open",   "pwrite64",  "pread64", "ftruncate", "fstat",
+                                  "unlink", "fdatasync", "fsync",   "rename"};
 
 void makeCallsFail() {
   sqlite3_vfs* system = sqlite3_vfs_find(nullptr);
@@ -203,6 +205,8 @@ class OutboxDiskTest : public testing::Test {
       FakeURLSessionFactory::Reply reply;
       if (isUp)
         ++taken_[std::atoi(std::string(request.body.view()).c_str())];
+      else if (++failures_ % 2 == 0)
+        reply = {.status = 503, .headers = {{"Retry-After", "60"}}};
       else
         reply.error = Error{kKYTURLErrorDomain, 28, "time-out"};
       return std::optional(std::move(reply));
@@ -225,6 +229,7 @@ class OutboxDiskTest : public testing::Test {
   std::unique_ptr<URLSession> session_;
   std::set<int> kept_;
   std::map<int, int> taken_;
+  int failures_ = 0;
 };
 
 // Whatever fails: nobody crashes, each event is in one place of the books, and what was said to be kept arrives.
@@ -240,7 +245,8 @@ TEST_F(OutboxDiskTest, ClosesItsBooksWhicheverCallOfTheSystemFails) {
           books_ = std::make_unique<Books>();
           kept_.clear();
           taken_.clear();
-          fault = {call, after, times, error, 0};
+          failures_ = 0;
+          fault = {.call = call, .after = after, .times = times, .error = error};
           answerEverything(false);
           start();
           for (int i = 0; i < 6; ++i) {
@@ -493,6 +499,64 @@ TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilled) {
     sure = there;
   }
   EXPECT_GT(seen, 0U);
+}
+
+// Before each of the calls by which it takes up a file of the version before.
+TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilledAsItTakesUpAnEarlierVersion) {
+  {
+    SQLitePostStore store(folder_.path());
+    for (int64_t number = 1; number <= 3; ++number) {
+      StoredPost post;
+      post.number = number;
+      post.url = "https://events.example.org/v1";
+      post.body = Data(std::string(1000, static_cast<char>('a' + number)));
+      const StoredPost* added = &post;
+      ASSERT_FALSE(store.change({&added, 1}, {}, false));
+    }
+  }
+  const std::string file = folder_ / "outbox.sqlite", before = folder_ / "before";
+  sqlite3* database = nullptr;
+  ASSERT_EQ(sqlite3_open(file.c_str(), &database), SQLITE_OK);
+  ASSERT_EQ(
+      sqlite3_exec(database, "DROP TABLE pauses; PRAGMA user_version=2; PRAGMA application_id=1264145410",
+                   nullptr, nullptr, nullptr),
+      SQLITE_OK);
+  sqlite3_close(database);
+  std::filesystem::rename(file, before);
+  makeCallsFail();
+  int kills = 0;
+  for (const char* call : {"open", "pwrite64", "ftruncate", "unlink", "fdatasync", "fsync"}) {
+    bool isKilled = true;
+    for (int after = 0; isKilled; ++after) {
+      for (const char* end : {"", "-wal", "-journal"}) std::filesystem::remove(file + end);
+      std::filesystem::copy_file(before, file);
+      const pid_t child = ::fork();
+      ASSERT_GE(child, 0);
+      if (child == 0) {
+        fault = {.call = call, .after = after, .kills = true};
+        SQLitePostStore store(folder_.path());
+        const bool isRead = !store.open([](const StoredPostHead&) {});
+        store.close();
+        ::_exit(isRead ? 0 : 1);
+      }
+      int status = 0;
+      ASSERT_EQ(::waitpid(child, &status, 0), child);
+      isKilled = WIFSIGNALED(status);
+      ASSERT_TRUE(isKilled || WEXITSTATUS(status) == 0);
+      kills += isKilled ? 1 : 0;
+      SQLitePostStore store(folder_.path());
+      std::vector<int64_t> there;
+      const auto problem = store.open([&](const StoredPostHead& head) {
+        if (!head.isUnreadable) there.push_back(head.post.number);
+      });
+      ASSERT_FALSE(problem) << problem->text;
+      EXPECT_EQ(there, std::vector<int64_t>({1, 2, 3})) << call << " " << after;
+      const PostStore::ServerPause pause{1, 2, 3};
+      EXPECT_FALSE(store.setPauses({&pause, 1}));
+    }
+  }
+  std::printf("killed at %d calls\n", kills);
+  EXPECT_GT(kills, 5);
 }
 
 }  // namespace
