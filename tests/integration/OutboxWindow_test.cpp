@@ -144,6 +144,48 @@ TEST_F(OutboxWindow, DropsWhatItIsTold) {
   EXPECT_EQ(waiting(), 0);
 }
 
+// Least of all does what a script left empty mean everything.
+TEST_F(OutboxWindow, DropsNothingByWhatCannotBeMeant) {
+  settings(kOn);
+  retryAfter("3600");
+  start();
+  keep(2);
+  const int64_t before = waiting();
+  const std::vector<std::vector<std::string>> wrong = {
+      {"drop", "--user", "-1"},
+      {"drop", "--user", "4294967296"},
+      {"drop", "--user", "99999999999999999999999"},
+      {"drop", "--user", "0x0"},
+      {"drop", "--user", " " + std::to_string(::getuid())},
+      {"drop", "--user", ""},
+      {"drop", "--server", ""},
+      {"drop", "--server", "", "--user", std::to_string(::getuid())},
+      {"drop", "--server", server(), "--user", ""},
+      {"drop", "--all", "--server", ""},
+      {"drop", "--all", "--user", ""},
+      {"drop", server()},
+      {"show"},
+      {"show", ""},
+      {"list", "more"},
+      {"flush", "more"},
+      {"empty"},
+      {}};
+  for (std::vector<std::string> arguments : wrong) {
+    arguments.insert(arguments.begin(), "outbox");
+    const ProgramRun run = kytctl(arguments);
+    EXPECT_GT(run.status, 0) << run.text;
+    EXPECT_LE(run.status, 2) << run.text;
+    EXPECT_EQ(waiting(), before) << run.text;
+  }
+  for (const std::string& none : {server() + "/events", server() + "\n", std::string("\x1b[2J\xff")}) {
+    EXPECT_EQ(json({"outbox", "drop", "--all", "--server", none}).integer("dropped"), 0);
+    const ProgramRun run = kytctl({"outbox", "show", none});
+    EXPECT_EQ(run.status, 1);
+    EXPECT_EQ(run.text.find('\x1b'), std::string::npos) << run.text;
+  }
+  EXPECT_EQ(waiting(), before);
+}
+
 TEST_F(OutboxWindow, SaysThatThereIsNone) {
   settings("");
   start();

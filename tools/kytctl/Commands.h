@@ -97,8 +97,8 @@ struct MetricsOptions {
 };
 
 struct OutboxDropOptions {
-  std::string server, user;  // the user by name or number; empty: any
-  bool all = false;          // meant so where neither is given
+  std::vector<std::string> server, user;  // one at most, the user by name or number; none: any
+  bool all = false;                       // meant so where neither is given
   bool json = false;
 };
 

@@ -380,8 +380,8 @@ void addOutbox(const Command& program, Arguments& a) {
   flush.flag("--json", a.json, "Print one JSON object");
   flush.runs([&a] { a.status = outboxFlushCommand(a.connection.root, a.json); });
   const Command drop = outbox.command("drop", "Delete what waits");
-  drop.option("--server", a.drop.server, "For this server alone");
-  drop.option("--user", a.drop.user, "Of this user's programs alone, by name or number");
+  drop.option("--server", a.drop.server, "For this server alone").repeatable();
+  drop.option("--user", a.drop.user, "Of this user's programs alone, by name or number").repeatable();
   drop.flag("--all", a.drop.all, "All of it");
   drop.flag("--json", a.drop.json, "Print one JSON object");
   drop.runs([&a] { a.status = outboxDropCommand(a.connection.root, a.drop); });
