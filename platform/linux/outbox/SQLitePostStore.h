@@ -57,7 +57,9 @@ class SQLitePostStore final : public PostStore {
  private:
   using Problem = std::optional<PostStoreProblem>;
   [[nodiscard]] std::string setAsideWithLog();
-  [[nodiscard]] Problem begin();  // opens the file, and makes it
+  [[nodiscard]] std::string freeAside() const;  // a name that nothing has yet
+  [[nodiscard]] bool removeStrayLog() const;    // puts it beside, where each is kept
+  [[nodiscard]] Problem begin();                // opens the file, and makes it
   [[nodiscard]] Problem makeFile();
   [[nodiscard]] Problem openFile();
   [[nodiscard]] Problem checkHeader(int descriptor) const;

@@ -15,6 +15,11 @@ namespace {
 
 constexpr char kAside[] = ".damaged", kLog[] = "-wal";
 
+bool isAnythingAt(const std::string& name) {
+  struct stat status {};
+  return ::lstat(name.c_str(), &status) == 0;
+}
+
 }  // namespace
 
 bool SQLitePostStore::removeSetAside(int64_t before) {
@@ -35,17 +40,26 @@ std::string SQLitePostStore::setAside() {
   return "it can be neither renamed nor removed: " + why;
 }
 
-std::string SQLitePostStore::setAsideWithLog() {
-  const auto isThere = [](const std::string& name) {
-    struct stat status {};
-    return ::lstat(name.c_str(), &status) == 0;
-  };
+// With the log of a file that is gone SQLite would put what was in that into the next one.
+bool SQLitePostStore::removeStrayLog() const {
+  const std::string log = file_ + kLog;
+  if (!isAnythingAt(log)) return true;
+  return aside_ == Aside::each ? std::rename(log.c_str(), (freeAside() + kLog).c_str()) == 0
+                               : ::unlink(log.c_str()) == 0;
+}
+
+std::string SQLitePostStore::freeAside() const {
   std::string aside = file_ + kAside;
-  for (unsigned i = 2; isThere(aside) || isThere(aside + kLog); ++i)
+  for (unsigned i = 2; isAnythingAt(aside) || isAnythingAt(aside + kLog); ++i)
     aside = file_ + kAside + "." + std::to_string(i);
+  return aside;
+}
+
+std::string SQLitePostStore::setAsideWithLog() {
+  const std::string aside = freeAside();
   // The log goes first: a file that begins anew would take it for its own.
   const bool isLogMoved =
-      !isThere(file_ + kLog) || std::rename((file_ + kLog).c_str(), (aside + kLog).c_str()) == 0;
+      !isAnythingAt(file_ + kLog) || std::rename((file_ + kLog).c_str(), (aside + kLog).c_str()) == 0;
   if (isLogMoved && std::rename(file_.c_str(), aside.c_str()) == 0) return "it is " + aside + " now";
   return "it cannot be renamed: " + errorText(errno);
 }

@@ -79,6 +79,7 @@ SQLitePostStore::Problem SQLitePostStore::makeFile() {
   if (::lstat(file_.c_str(), &link) == 0)
     return PostStoreProblem{Kind::unavailable, file_ + ": is no regular file"};
   unlinkAll();
+  if (!removeStrayLog()) return PostStoreProblem{Kind::unavailable, file_ + "-wal: " + errorText(errno)};
   // Made here for its mode, which SQLite gives its log too.
   if (ownDescriptor(::open(made.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, kMode)).get() <
       0)

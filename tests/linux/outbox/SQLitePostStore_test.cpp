@@ -2,8 +2,11 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -270,6 +273,63 @@ TEST_F(SQLitePostStoreThatKeepsEach, SetsAsideFileAndLogAndOverwritesNone) {
   expectHasPost("outbox.sqlite.damaged", 1);
   expectHasPost("outbox.sqlite.damaged.2", 2);
   expectHasPost("outbox.sqlite.damaged.3", 3);
+}
+
+// A process that is killed as it removes its file, or a person that removes the file alone, leaves the log.
+TEST_F(SQLitePostStoreThatKeepsEach, TakesNothingFromTheLogOfAFileThatIsGone) {
+  makeDamagedFile(1);
+  std::filesystem::remove(file());
+  ASSERT_TRUE(std::filesystem::exists(folder_ / "outbox.sqlite-wal"));
+  std::filesystem::remove(folder_ / "copy");
+  std::filesystem::remove(folder_ / "copy-wal");
+  {
+    SQLitePostStore store(folder_.path());
+    EXPECT_TRUE(numbersIn(store).empty());
+    EXPECT_FALSE(add(store, somePost(9)));
+  }
+  {
+    SQLitePostStore store(folder_.path());
+    EXPECT_EQ(numbersIn(store), std::vector<int64_t>({9}));
+    EXPECT_EQ(bytesOnDisk().find(somePost(1).url), std::string::npos);
+  }
+  // Of a spool no byte is lost.
+  makeDamagedFile(2);
+  const auto size = std::filesystem::file_size(folder_ / "outbox.sqlite-wal");
+  std::filesystem::remove(file());
+  SQLitePostStore spool(folder_.path(), "libsqlite3.so.0", SQLitePostStore::Aside::each);
+  EXPECT_FALSE(add(spool, somePost(9)));
+  EXPECT_EQ(numbersIn(spool), std::vector<int64_t>({9}));
+  EXPECT_EQ(std::filesystem::file_size(folder_ / "outbox.sqlite.damaged-wal"), size);
+}
+
+TEST_F(SQLitePostStoreTest, LeavesAFileAloneThatAnotherProcessHas) {
+  int ends[2];
+  ASSERT_EQ(::pipe(ends), 0);
+  const pid_t other = ::fork();
+  ASSERT_GE(other, 0);
+  if (other == 0) {
+    SQLitePostStore store(folder_.path());
+    const char isThere = add(store, somePost(1)) ? 'n' : 'y';
+    static_cast<void>(::write(ends[1], &isThere, 1));
+    for (;;) ::pause();
+  }
+  char isThere = 0;
+  ASSERT_EQ(::read(ends[0], &isThere, 1), 1);
+  ASSERT_EQ(isThere, 'y');
+  SQLitePostStore store(folder_.path());
+  std::optional<PostStoreProblem> problem;
+  EXPECT_TRUE(numbersIn(store, &problem).empty());
+  ASSERT_TRUE(problem);
+  EXPECT_EQ(problem->kind, Kind::unavailable) << problem->text;
+  problem = add(store, somePost(2));
+  ASSERT_TRUE(problem);
+  EXPECT_EQ(problem->kind, Kind::unavailable) << problem->text;
+  EXPECT_EQ(store.note(PostStore::Note::consentEpoch), 0);
+  ::kill(other, SIGKILL);
+  ASSERT_EQ(::waitpid(other, nullptr, 0), other);
+  for (const int end : ends) ::close(end);
+  EXPECT_EQ(numbersIn(store), std::vector<int64_t>({1})) << "once it has ended";
+  EXPECT_FALSE(add(store, somePost(2)));
 }
 
 TEST_F(SQLitePostStoreTest, FindsEveryByteThatIsNotAsItWas) {
