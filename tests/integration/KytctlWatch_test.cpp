@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "platform/base/Limits.h"
+#include "platform/base/TextEscape.h"
 #include "platform/ipc/Handshake.h"
 #include "platform/ipc/MessageWriter.h"
 #include "platform/linux/base/Descriptors.h"
@@ -175,6 +176,26 @@ TEST_F(KytctlWatch, FiltersByCategoryAndUser) {
   EXPECT_TRUE(ofCategory.shows(" 6/1 "));
   EXPECT_EQ(ofCategory.text().find(" 5/1 "), std::string::npos);
   EXPECT_EQ(ofNobody.lines().size(), 1U);
+}
+
+TEST_F(KytctlWatch, WritesNothingThatATerminalObeys) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  const std::string name = "a\u009b31m\u202e\x7f";
+  Running forPeople(root(), {"--client", name}), forPrograms(root(), {"--client", name, "--json"});
+  ASSERT_TRUE(forPeople.shows("FATE")) << forPeople.text();
+  TestClient client(socket(), 7, name);
+  EXPECT_EQ(client.configure(), "live:");
+  // The other may come later.
+  EXPECT_TRUE(eventually([&] {
+    EXPECT_TRUE(client.send(6, 1, {}));
+    return !forPrograms.lines().empty();
+  }));
+  EXPECT_TRUE(forPeople.shows(" 6/1 ")) << forPeople.text();
+  for (const Running* watch : {&forPeople, &forPrograms})
+    for (const std::string& line : watch->lines()) EXPECT_TRUE(isPlainText(line)) << escapedText(line);
+  EXPECT_EQ(object(forPrograms.lines().at(0)).string("client")->str(), name);
 }
 
 TEST_F(KytctlWatch, LetsFourWatchAndTakesAnotherWhereOneHasGone) {

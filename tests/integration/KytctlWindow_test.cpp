@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/base/Limits.h"
+#include "platform/base/TextEscape.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "tests/integration/DaemonProcess.h"
 #include "tests/integration/StageFixture.h"
@@ -32,12 +33,13 @@ size_t characters(const std::string& line) {
 
 class KytctlWindow : public StageTest {
  protected:
-  // One object on one line.
+  // One object on one line, which holds nothing that steers a terminal.
   Dictionary json(std::vector<std::string> command) const {
     command.emplace_back("--json");
     const ProgramRun run = kytctl(command);
     EXPECT_EQ(run.status, 0) << run.text;
     EXPECT_EQ(linesOf(run.text).size(), 1U) << run.text;
+    for (const std::string& line : linesOf(run.text)) EXPECT_TRUE(isPlainText(line)) << escapedText(line);
     auto parsed = RapidJSON().parse(run.text);
     const auto* value = std::get_if<Value>(&parsed);
     if (value == nullptr || value->dictionary() == nullptr) {
@@ -202,7 +204,8 @@ TEST_F(KytctlWindow, IsNotConfusedByNamesOfAnyKind) {
   lay();
   putBag("cadmor", {entry("a")});
   startDaemon();
-  const std::string garbage = "\x1b[2J\"},{\\\n# EOF\n\t\xff\xfe\u202e{}=\"1\" " + std::string(300, 'w');
+  const std::string garbage =
+      "\x1b[2J\"},{\\\n# EOF\n\t\xff\xfe\u202e\u009b31m{}=\"1\" " + std::string(300, 'w');
   TestClient client(socket(), 7, garbage);
   EXPECT_EQ(client.configure(), "live:");
   EXPECT_TRUE(client.send(5, 1, {}));

@@ -1,7 +1,10 @@
 // What `kytctl explain` tells of an event: without a daemon, on a stage whose server has the storebags; and that the
 // daemon then does the same.
 #include <filesystem>
+#include <sstream>
+#include <variant>
 
+#include "platform/base/TextEscape.h"
 #include "platform/linux/base/UnixSocket.h"
 #include "platform/linux/data/RapidJSON.h"
 #include "tests/integration/StageFixture.h"
@@ -249,6 +252,15 @@ TEST_F(KytctlExplain, WritesLinesOfAtMostAHundredColumns) {
   size_t begin = 0;
   for (size_t end = 0; (end = told.text.find('\n', begin)) != std::string::npos; begin = end + 1)
     EXPECT_LE(end - begin, 100U) << told.text.substr(begin, end - begin);
+}
+
+TEST_F(KytctlExplain, WritesJSONThatCanBeReadAndThatNoTerminalObeys) {
+  layWithPerson();
+  const ProgramRun told = run({"--service", "s\xff\u009b31m\u202e", "--json"});
+  const auto parsed = RapidJSON().parse(told.text);
+  EXPECT_TRUE(std::holds_alternative<Value>(parsed)) << escapedText(told.text);
+  std::istringstream lines(told.text);
+  for (std::string line; std::getline(lines, line);) EXPECT_TRUE(isPlainText(line)) << escapedText(line);
 }
 
 TEST_F(KytctlExplain, LooksForTheProgramsEntitlement) {

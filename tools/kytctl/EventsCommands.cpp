@@ -10,6 +10,7 @@
 #include "tools/events/EventsFile.h"
 #include "tools/events/Generate.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StorebagServices.h"
 
 namespace kyt::tools {
@@ -42,7 +43,7 @@ void print(const EventsFile& file, const EventsVerdict& verdict) {
                 file.events.size(), numberOfFields(file));
 }
 
-void printJSON(JSON& json, const EventsFile& file, const std::string& bag, const EventsVerdict& verdict) {
+void printJSON(const EventsFile& file, const std::string& bag, const EventsVerdict& verdict) {
   Array findings;
   for (const EventFinding& finding : verdict.findings) {
     Dictionary row{{"line", unsigned{finding.line}}, {"kind", finding.kind}};
@@ -54,9 +55,7 @@ void printJSON(JSON& json, const EventsFile& file, const std::string& bag, const
   const Dictionary report{{"file", escapedText(file.name)}, {"storebag", escapedText(bag)},
                           {"events", file.events.size()},   {"fields", numberOfFields(file)},
                           {"findings", findings},           {"further", verdict.further}};
-  std::string text;
-  json.writePretty(report, text);
-  std::printf("%s\n", text.c_str());
+  std::printf("%s\n", prettyJSON(report).c_str());
 }
 
 int write(const std::string& text, const std::string& output) {
@@ -91,7 +90,7 @@ int checkEventsCommand(const EventsOptions& options) {
   const EventsFile& file = std::get<EventsFile>(read);
   const EventsVerdict verdict = checkEvents(file, std::get<Dictionary>(bag));
   if (options.json)
-    printJSON(services.json, file, options.bag, verdict);
+    printJSON(file, options.bag, verdict);
   else
     print(file, verdict);
   return verdict.findings.empty() ? 0 : 1;

@@ -13,6 +13,7 @@
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/DevicePorts.h"
 #include "tools/kytctl/ExplainText.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StorebagSource.h"
 
 namespace kyt::tools {
@@ -105,9 +106,7 @@ int explainCommand(const std::string& root, const ExplainOptions& options) {
       explain(ports.device(source.isSigned()),
               {.server = source.answers(), .from = source.from(), .problem = source.problem()}, facts);
   if (options.json) {
-    std::string json;
-    ports.json().writePretty(explanation.report, json);
-    std::printf("%s\n", json.c_str());
+    std::printf("%s\n", prettyJSON(explanation.report).c_str());
   } else {
     std::fputs(explainText(explanation.report).c_str(), stdout);
   }

@@ -4,8 +4,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/linux/data/RapidJSON.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/WindowClient.h"
 
 namespace kyt::tools {
@@ -47,11 +47,7 @@ int metricsCommand(const std::string& root, const MetricsOptions& options) {
   if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   auto& text = std::get<std::string>(answer);
   if (options.textFormat) text = textFormat(text);
-  if (options.json) {
-    std::string json;
-    RapidJSON().writeCompact(Dictionary{{"openmetrics", text}}, json);
-    text = json + '\n';
-  }
+  if (options.json) text = compactJSON(Dictionary{{"openmetrics", text}}) + "\n";
   std::fputs(text.c_str(), stdout);
   return 0;
 }

@@ -26,6 +26,7 @@
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Columns.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/WaitingEvents.h"
 #include "tools/kytctl/WaitingPosts.h"
 
@@ -137,9 +138,7 @@ class Owner {
       std::fprintf(stderr,
                    "kytctl: What waits in the outbox is counted, not written: the daemon has it open\n");
     }
-    std::string text;
-    json_.writePretty(Value(all), text);
-    text += '\n';
+    const std::string text = prettyJSON(all) + "\n";
     if (file != "-") return writeFile(file, text, 0600);
     std::fwrite(text.data(), 1, text.size(), stdout);
     return std::nullopt;
@@ -346,10 +345,7 @@ int ownerShowCommand(const std::string& root, bool json) {
   if (!json) {
     owner.print();
   } else {
-    RapidJSON writer;
-    std::string text;
-    writer.writePretty(Value(owner.object()), text);
-    std::printf("%s\n", text.c_str());
+    std::printf("%s\n", prettyJSON(owner.object()).c_str());
   }
   return owner.isWhole() ? 0 : 1;
 }

@@ -10,6 +10,7 @@
 #include "tools/explain/Simulation.h"
 #include "tools/kytctl/Commands.h"
 #include "tools/kytctl/DevicePorts.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StorebagSource.h"
 
 namespace kyt::tools {
@@ -102,9 +103,7 @@ int simulateCommand(const std::string& root, const SimulateOptions& options) {
                read.sessions, {options.devices, options.seed});
   report.set("storebag", options.bag);
   if (options.json) {
-    std::string json;
-    ports.json().writePretty(report, json);
-    std::printf("%s\n", json.c_str());
+    std::printf("%s\n", prettyJSON(report).c_str());
   } else {
     print(report, report.dictionary("aDay")->find("bytes")->doubleValue());
   }

@@ -12,6 +12,7 @@
 #include "platform/linux/base/LinuxClock.h"
 #include "tools/StorebagFile.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StorebagServices.h"
 
 namespace kyt::tools {
@@ -35,26 +36,6 @@ std::variant<Dictionary, Error> openDocument(StorebagServices& services, const s
 void printWarnings(const Dictionary& bag) {
   for (const std::string& warning : StorebagFile::warnings(bag))
     std::fprintf(stderr, "warning: %s\n", escapedText(warning).c_str());
-}
-
-// What a terminal would obey stands in the texts of the JSON alone, and there it may be written as its number.
-std::string harmlessJSON(std::string_view text) {
-  std::string out;
-  while (!text.empty()) {
-    const std::string_view character = text.substr(0, std::max<size_t>(utf8SequenceLength(text), 1));
-    text.remove_prefix(character.size());
-    if (character == "\n" || isPlainText(character)) {
-      out += character;
-      continue;
-    }
-    uint32_t code = static_cast<unsigned char>(character[0]) & (0xFFU >> (character.size() + 1));
-    if (character.size() == 1) code = static_cast<unsigned char>(character[0]);
-    for (const char c : character.substr(1)) code = code << 6 | (static_cast<unsigned char>(c) & 0x3FU);
-    char number[8];
-    std::snprintf(number, sizeof number, "\\u%04x", code & 0xFFFFU);
-    out += number;
-  }
-  return out;
 }
 
 }  // namespace
@@ -123,9 +104,7 @@ int showCommand(const std::string& document, const std::string& publicKey) {
   StorebagServices services;
   auto bag = openDocument(services, document, publicKey);
   if (auto* error = std::get_if<Error>(&bag)) return failed(document + ": " + error->localizedDescription);
-  std::string text;
-  services.json.writePretty(std::get<Dictionary>(bag), text);
-  std::printf("%s\n", harmlessJSON(text).c_str());
+  std::printf("%s\n", prettyJSON(std::get<Dictionary>(bag)).c_str());
   printWarnings(std::get<Dictionary>(bag));
   return 0;
 }

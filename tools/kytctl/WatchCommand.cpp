@@ -6,9 +6,9 @@
 
 #include "platform/base/ReportingProgram.h"
 #include "platform/base/TextEscape.h"
-#include "platform/linux/data/RapidJSON.h"
 #include "tools/kytctl/Columns.h"
 #include "tools/kytctl/Commands.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StatusText.h"
 #include "tools/kytctl/WindowClient.h"
 #include "tools/kytctl/WindowOutput.h"
@@ -69,8 +69,7 @@ std::string bodyLines(const Dictionary& event) {
 void print(const Dictionary& event, bool json) {
   std::string text;
   if (json) {
-    RapidJSON().writeCompact(event, text);
-    text += '\n';
+    text = compactJSON(event) + "\n";
   } else {
     if (const int64_t lost = numberIn(event, "lost"); lost != 0)
       text = "    " + std::to_string(lost) + " were not told: more passed than was read here\n";

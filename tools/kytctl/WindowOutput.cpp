@@ -6,15 +6,13 @@
 #include <cstdio>
 
 #include "platform/base/TextEscape.h"
-#include "platform/linux/data/RapidJSON.h"
+#include "tools/kytctl/JSONText.h"
 #include "tools/kytctl/StatusText.h"
 
 namespace kyt::tools {
 
 void printJSON(const Value& value) {
-  std::string text;
-  RapidJSON().writeCompact(value, text);
-  std::printf("%s\n", text.c_str());
+  std::printf("%s\n", compactJSON(value).c_str());
 }
 
 Value listed(const char* key, std::vector<Dictionary> rows) {
