@@ -178,6 +178,21 @@ TEST_F(KytctlWatch, FiltersByCategoryAndUser) {
   EXPECT_EQ(ofNobody.lines().size(), 1U);
 }
 
+TEST_F(KytctlWatch, FiltersByTheEmptyClientNameAsByAnyOther) {
+  lay();
+  putBag("cadmor", {entry("a")});
+  startDaemon();
+  Running ofNameless(root(), {"--client", ""});
+  ASSERT_TRUE(ofNameless.shows("FATE")) << ofNameless.text();
+  TestClient named(socket(), 7, "a"), nameless(socket(), 7);
+  ASSERT_EQ(named.configure(), "live: httppost");
+  report(named, 5);
+  ASSERT_EQ(nameless.configure(), "live: httppost");
+  report(nameless, 6);
+  EXPECT_TRUE(ofNameless.shows(" 6/1 ")) << ofNameless.text();
+  EXPECT_EQ(ofNameless.text().find(" 5/1 "), std::string::npos) << ofNameless.text();
+}
+
 TEST_F(KytctlWatch, WritesNothingThatATerminalObeys) {
   lay();
   putBag("cadmor", {entry("a")});

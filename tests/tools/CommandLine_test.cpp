@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include "tests/support/Programs.h"
+#include "tests/support/TemporaryFolder.h"
 
 namespace kyt {
 namespace {
@@ -49,6 +50,44 @@ TEST(CommandLineOfKytctl, HintsAtTheHelpOfTheCommandThatWasMeant) {
   const ProgramRun wrong = runProgram(KYT_PROGRAMS "/kytctl", {"defaults", "write", "domain"});
   EXPECT_EQ(wrong.status, 2);
   EXPECT_EQ(wrong.text, "kytctl: key is required\nTry 'kytctl defaults write --help'.\n");
+}
+
+TEST(CommandLineOfKytctl, NamesACommandThatThereIsNot) {
+  for (const auto& [command, of] : std::vector<std::pair<std::vector<std::string>, std::string>>{
+           {{"stauts", "--json"}, "kytctl"}, {{"consent", "stauts"}, "kytctl consent"}}) {
+    const ProgramRun wrong = runProgram(KYT_PROGRAMS "/kytctl", command);
+    EXPECT_EQ(wrong.status, 2);
+    EXPECT_EQ(wrong.text, "kytctl: there is no command stauts\nTry '" + of + " --help'.\n");
+  }
+  EXPECT_EQ(runProgram(KYT_PROGRAMS "/kytctl", {}).text,
+            "kytctl: A subcommand is required\nTry 'kytctl --help'.\n");
+}
+
+// What is left of an option where a script's variable is not set: it would watch, explain or drop what nobody meant.
+TEST(CommandLineOfKytctl, RefusesAnEmptyValueWhereItMeansNothing) {
+  const std::vector<std::string> commands[] = {
+      {"watch", "--user", ""},
+      {"watch", "--category", ""},
+      {"explain", "{}", "--client-type", ""},
+      {"explain", "{}", "--draw", ""},
+      {"explain", "{}", "--user", ""},
+      {"explain", "{}", "--user", "0", "--program", ""},
+      {"explain", "{}", "--storebag", ""},
+      {"entitlements", "check", "--user", ""},
+      {"send", "--client-type", "7", "--category", ""},
+      {"storebag", "sign", "bag.json", "--key", "key.pem", "-o", "out", "--serial", ""},
+      {"ring", "--set", ""},
+      {"ring", "--identifier", ""},
+      {"outbox", "drop", "--server", "https://a.example", "--user", ""},
+      {"outbox", "drop", "--user", "0", "--server", ""}};
+  const TemporaryFolder root;
+  for (const auto& command : commands) {
+    std::vector<std::string> arguments{"--root", root.path()};
+    arguments.insert(arguments.end(), command.begin(), command.end());
+    const ProgramRun wrong = runProgram(KYT_PROGRAMS "/kytctl", arguments);
+    EXPECT_EQ(wrong.status, 2) << wrong.text;
+    EXPECT_TRUE(has(wrong.text, " is empty\nTry 'kytctl ")) << command[0] << ": " << wrong.text;
+  }
 }
 
 }  // namespace

@@ -84,8 +84,8 @@ struct ExplainOptions {
 };
 
 struct WatchOptions {
-  std::string user;  // a name or a number; empty: all
-  std::string client;
+  std::string user;                   // a name or a number; empty: all
+  std::optional<std::string> client;  // empty: those without a name
   std::optional<uint16_t> category;
   bool bodies = false;
   bool json = false;
@@ -97,8 +97,8 @@ struct MetricsOptions {
 };
 
 struct OutboxDropOptions {
-  std::vector<std::string> server, user;  // one at most, the user by name or number; none: any
-  bool all = false;                       // meant so where neither is given
+  std::string server, user;  // the user by name or number; empty: any
+  bool all = false;          // meant so where neither is given
   bool json = false;
 };
 

@@ -160,14 +160,10 @@ int outboxDropCommand(const std::string& root, const OutboxDropOptions& options)
   Dictionary filter;
   if (!options.all && options.server.empty() && options.user.empty())
     return failed("Say which posts: --server, --user, or --all");
-  // What a script has left empty does not mean all.
-  for (const auto* given : {&options.server, &options.user})
-    if (given->size() > 1 || (!given->empty() && given->front().empty()))
-      return failed("Say one server after --server, one user after --user");
-  if (!options.server.empty()) filter.set("server", options.server.front());
+  if (!options.server.empty()) filter.set("server", options.server);
   if (!options.user.empty()) {
-    const std::optional<uint32_t> user = userOf(options.user.front());
-    if (!user) return failed("There is no user " + options.user.front());
+    const std::optional<uint32_t> user = userOf(options.user);
+    if (!user) return failed("There is no user " + options.user);
     filter.set("user", *user);
   }
   auto client = WindowClient::connect(root);

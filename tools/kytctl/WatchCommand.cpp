@@ -89,7 +89,7 @@ int watchCommand(const std::string& root, const WatchOptions& options) {
     if (!user) return failed("There is no user " + options.user);
     filter.set("user", *user);
   }
-  if (!options.client.empty()) filter.set("client", options.client);
+  if (options.client) filter.set("client", *options.client);
   if (options.category) filter.set("category", *options.category);
   if (options.bodies) filter.set("bodies", true);
   auto client = WindowClient::connect(root);

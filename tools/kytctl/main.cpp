@@ -160,16 +160,20 @@ void addExplain(const Command& program, Arguments& a) {
   explain.option("--client", o.client, "The client's name in the user information").excludes(userInfo);
   explain.option("--service", o.service, "The service's name in the user information").excludes(userInfo);
   explain.flag("--single", o.single, "A single message, without a session");
-  const CommandOption bag = explain.option(
-      "--storebag", o.storebag,
-      "A document, or a bag not signed yet (.json, .toml, .plist), instead of the one in force");
+  const CommandOption bag =
+      explain
+          .option("--storebag", o.storebag,
+                  "A document, or a bag not signed yet (.json, .toml, .plist), instead of the one in force")
+          .notEmpty();
   explain.flag("--fetch", o.fetch, "The server's storebag, also where a running daemon has one")
       .excludes(bag);
   const CommandOption pid = explain.option("--pid", o.program.pid, "The program, a process")
                                 .between(1, std::numeric_limits<int32_t>::max());
   explain.option("--user", o.program.user, "Any process of a user instead; your own without either")
+      .notEmpty()
       .excludes(pid);
   explain.option("--program", o.program.program, "Of that user, one that runs this program file")
+      .notEmpty()
       .excludes(pid);
   explain.option("--draw", o.draw, "The session's sampling draw, 0 to 1; all are tried without")
       .between(0.0, 1.0);
@@ -231,7 +235,7 @@ void addEntitlements(const Command& program, Arguments& a) {
   const Command check = entitlements.command("check", "Tell why a client is served or refused");
   const CommandOption pid =
       check.option("--pid", a.check.pid, "A process").between(1, std::numeric_limits<int32_t>::max());
-  check.option("--user", a.check.user, "Any process of a user, by name or number").excludes(pid);
+  check.option("--user", a.check.user, "Any process of a user, by name or number").notEmpty().excludes(pid);
   check.runs([&a] {
     a.unwritten = 2;  // 1 would tell that the client is refused
     a.status = entitlementsCheckCommand(a.connection.root, a.check);
@@ -266,8 +270,9 @@ void addRollOut(const Command& program, const Command& bag, Arguments& a) {
 
   const Command ring =
       program.command("ring", "Print in which of 100 rings this device is, or set its address");
-  ring.option("--identifier", a.ring.identifier, "Of another device, as it reports it");
-  ring.option("--set", a.ring.address, "Take storebags from this address from now on; {ring} is the ring");
+  ring.option("--identifier", a.ring.identifier, "Of another device, as it reports it").notEmpty();
+  ring.option("--set", a.ring.address, "Take storebags from this address from now on; {ring} is the ring")
+      .notEmpty();
   ring.ends(kRing);
   ring.runs([&a] { a.status = ringCommand(a.connection.root, a.ring); });
 }
@@ -353,8 +358,8 @@ void addWindow(const Command& program, Arguments& a) {
       .excludes(json);
   metrics.runs([&a] { a.status = metricsCommand(a.connection.root, a.metrics); });
   const Command watch = program.command("watch", "Print events as they pass, with their fate");
-  watch.option("--user", a.watch.user, "Of this user's programs alone, by name or number");
-  watch.option("--client", a.watch.client, "Of clients of this name alone");
+  watch.option("--user", a.watch.user, "Of this user's programs alone, by name or number").notEmpty();
+  watch.option("--client", a.watch.client, "Of clients of this name alone, which may be empty");
   watch.option("--category", a.watch.category, "Of this category alone");
   watch.flag("--bodies", a.watch.bodies, "Print the body of each request too, as it left");
   watch.flag("--json", a.watch.json, "Print one JSON object a line");
@@ -380,8 +385,8 @@ void addOutbox(const Command& program, Arguments& a) {
   flush.flag("--json", a.json, "Print one JSON object");
   flush.runs([&a] { a.status = outboxFlushCommand(a.connection.root, a.json); });
   const Command drop = outbox.command("drop", "Delete what waits");
-  drop.option("--server", a.drop.server, "For this server alone").repeatable();
-  drop.option("--user", a.drop.user, "Of this user's programs alone, by name or number").repeatable();
+  drop.option("--server", a.drop.server, "For this server alone").notEmpty();
+  drop.option("--user", a.drop.user, "Of this user's programs alone, by name or number").notEmpty();
   drop.flag("--all", a.drop.all, "All of it");
   drop.flag("--json", a.drop.json, "Print one JSON object");
   drop.runs([&a] { a.status = outboxDropCommand(a.connection.root, a.drop); });

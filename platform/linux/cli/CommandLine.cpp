@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <string>
+#include <type_traits>
 #include <utility>
 
 #include "platform/base/TextEscape.h"
@@ -24,9 +25,28 @@ std::string understoodCommand(const CLI::App& app) {
   return text;
 }
 
+const CLI::App& understood(const CLI::App& app) {
+  const CLI::App* at = &app;
+  while (!at->get_subcommands().empty()) at = at->get_subcommands().front();
+  return *at;
+}
+
+// Where a command is wanted and something else stands: CLI11 says only that one is wanted.
+std::optional<std::string> unknownCommand(const CLI::App& app) {
+  if (understood(app).get_require_subcommand_min() == 0) return std::nullopt;
+  for (const std::string& word : app.remaining(true))
+    if (!word.starts_with('-')) return "there is no command " + word;
+  return std::nullopt;
+}
+
 void complain(const CLI::App& app, const std::string& what) {
   std::fprintf(stderr, "%s: %s\n", app.get_name().c_str(), escapedText(what).c_str());
 }
+
+template <typename Target>
+constexpr bool kIsNumber = std::is_arithmetic_v<Target>;
+template <typename Target>
+constexpr bool kIsNumber<std::optional<Target>> = kIsNumber<Target>;
 
 }  // namespace
 
@@ -62,16 +82,26 @@ CommandOption CommandOption::excludes(CommandOption other) const {
   return *this;
 }
 
+// What a script's unset variable leaves of an option is not what the option's absence means.
+CommandOption CommandOption::notEmpty() const {
+  option_.check([](const std::string& value) { return std::string(value.empty() ? "is empty" : ""); });
+  return *this;
+}
+
 CommandOption CommandOption::repeatable() const {
   option_.allow_extra_args(false);
   return *this;
 }
 
+// CLI11 takes an empty text for the number 0.
 template <typename Target>
 CommandOption Command::option(const char* name, Target& target, const char* help) const {
-  return CommandOption(*app_.add_option(name, target, help));
+  const CommandOption option(*app_.add_option(name, target, help));
+  if constexpr (kIsNumber<Target>) static_cast<void>(option.notEmpty());
+  return option;
 }
 template CommandOption Command::option(const char*, std::string&, const char*) const;
+template CommandOption Command::option(const char*, std::optional<std::string>&, const char*) const;
 template CommandOption Command::option(const char*, std::vector<std::string>&, const char*) const;
 template CommandOption Command::option(const char*, std::filesystem::path&, const char*) const;
 template CommandOption Command::option(const char*, uint16_t&, const char*) const;
@@ -126,7 +156,7 @@ std::optional<int> CommandLine::parse(int argc, char** argv) const {
     return std::nullopt;
   } catch (const CLI::ParseError& error) {
     if (error.get_exit_code() == 0) return app_->exit(error);  // prints the help or the version
-    complain(*app_, error.what());
+    complain(*app_, unknownCommand(*app_).value_or(error.what()));
     std::fprintf(stderr, "Try '%s --help'.\n", understoodCommand(*app_).c_str());
     return kWrongUsage;
   } catch (const std::exception& error) {

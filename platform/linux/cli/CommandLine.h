@@ -33,6 +33,7 @@ class CommandOption {
   CommandOption between(Number lowest, Number highest) const;
   CommandOption oneOf(std::vector<std::string> words) const;
   CommandOption excludes(CommandOption other) const;
+  CommandOption notEmpty() const;  // a text without a character is wrong usage, as it always is for a number
   CommandOption repeatable() const;  // of a list: one value each time that it is given
 
  private:
