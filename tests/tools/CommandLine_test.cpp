@@ -1,6 +1,10 @@
 // What the command lines of all programs have in common.
 #include <gtest/gtest.h>
 
+#include <string>
+#include <utility>
+#include <vector>
+
 #include "tests/support/Programs.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -61,6 +65,27 @@ TEST(CommandLineOfKytctl, NamesACommandThatThereIsNot) {
   }
   EXPECT_EQ(runProgram(KYT_PROGRAMS "/kytctl", {}).text,
             "kytctl: A subcommand is required\nTry 'kytctl --help'.\n");
+}
+
+TEST(CommandLineOfKytctl, EndsWithAnErrorWhenItCannotWrite) {
+  const TemporaryFolder root;
+  const std::string program = std::string("'") + KYT_PROGRAMS "/kytctl' --root '" + root.path() + "' ";
+  const std::pair<const char*, int> commands[] = {{"--help", 1},
+                                                  {"--version", 1},
+                                                  {"explain --help", 1},
+                                                  {"explain '{\"Category\":1,\"Type\":1}' --json", 2},
+                                                  {"explain '{\"Category\":1,\"Type\":1}'", 2},
+                                                  {"entitlements check --user 0", 2},
+                                                  {"consent show", 1},
+                                                  {"owner show", 1},
+                                                  {"owner show --json", 1},
+                                                  {"owner export -", 1},
+                                                  {"ring", 1}};
+  for (const auto& [command, status] : commands) {
+    const ProgramRun run = runProgram("sh", {"-c", program + command + " >/dev/full"});
+    EXPECT_EQ(run.status, status) << command;
+    EXPECT_TRUE(has(run.text, "kytctl: can't write the output")) << command << ": " << run.text;
+  }
 }
 
 // What is left of an option where a script's variable is not set: it would watch, explain or drop what nobody meant.

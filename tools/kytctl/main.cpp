@@ -420,6 +420,7 @@ int main(int argc, char** argv) {
   addEvents(program, arguments);
   addWindow(program, arguments);
   addOutbox(program, arguments);
-  if (const auto status = program.parse(argc, argv)) return *status;
-  return isOutputWritten() ? arguments.status : std::max(arguments.status, arguments.unwritten);
+  const std::optional<int> ended = program.parse(argc, argv);
+  const int status = ended.value_or(arguments.status);
+  return isOutputWritten() ? status : std::max(status, arguments.unwritten);
 }
