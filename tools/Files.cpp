@@ -5,6 +5,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
+#include <system_error>
 
 #include "tools/StorebagFile.h"
 
@@ -26,6 +28,23 @@ bool writeAll(int fd, std::string_view bytes) {
     bytes.remove_prefix(static_cast<size_t>(written));
   }
   return true;
+}
+
+// The names of devices and of open files: /dev/stdout leads to a file that is not to be replaced, nor is the link itself.
+bool isInFolderOfDevices(const std::string& path) {
+  std::error_code error;
+  const std::string folder =
+      std::filesystem::canonical(std::filesystem::absolute(path, error).parent_path(), error).string();
+  return !error && (folder == "/dev" || (folder + "/").starts_with("/proc/"));
+}
+
+std::optional<Error> writeInto(const std::string& path, std::string_view bytes) {
+  const int fd = open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC | O_NOCTTY);
+  if (fd < 0) return failure(path);
+  std::optional<Error> error;
+  if (!writeAll(fd, bytes)) error = failure(path);
+  close(fd);
+  return error;
 }
 
 }  // namespace
@@ -57,6 +76,13 @@ std::variant<std::string, Error> readFile(const std::string& path) {
 }
 
 std::optional<Error> writeFile(const std::string& path, std::string_view bytes, unsigned mode) {
+  struct stat there = {};
+  if (isInFolderOfDevices(path)) return writeInto(path, bytes);
+  if (lstat(path.c_str(), &there) == 0) {
+    if (S_ISCHR(there.st_mode)) return writeInto(path, bytes);
+    if (S_ISFIFO(there.st_mode) || S_ISSOCK(there.st_mode) || S_ISBLK(there.st_mode))
+      return Error{"KYTToolsErrorDomain", 1, path + " is no regular file"};
+  }
   std::string temporary = path + ".XXXXXX";
   const int fd = mkostemp(temporary.data(), O_CLOEXEC);
   if (fd < 0) return failure(path);

@@ -57,7 +57,8 @@ class StorebagFile {
 
 // Whole files. Errors name the path and the reason.
 [[nodiscard]] std::variant<std::string, Error> readFile(const std::string& path);
-// Replaces the file atomically; `mode` as chmod takes it.
+// Replaces the file atomically; `mode` as chmod takes it. Into a character device, and what /dev and /proc name (/dev/stdout),
+// it writes; another thing that is no file stays, and is an error: whoever made it would read along.
 [[nodiscard]] std::optional<Error> writeFile(const std::string& path, std::string_view bytes, unsigned mode);
 
 }  // namespace tools

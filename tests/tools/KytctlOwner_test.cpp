@@ -243,6 +243,7 @@ TEST_F(KytctlOwner, TakesAllAlongInAFileOfHisOwn) {
   EXPECT_TRUE(has(logs.begin()->dictionary()->string("text")->str(), "\"step\": 2")) << "what was posted";
   EXPECT_FALSE(list(*all.find("leftByHour")->dictionary(), "rows").empty());
   EXPECT_EQ(object(kytctl({"owner", "export", "-"}).text).size(), all.size());
+  EXPECT_EQ(object(kytctl({"owner", "export", "/dev/fd/1"}).text).size(), all.size());
   const ProgramRun nowhere = kytctl({"owner", "export", stage_->folder() + "/missing/file"});
   EXPECT_EQ(nowhere.status, 1);
   EXPECT_TRUE(has(nowhere.text, "missing/file: No such file or directory")) << nowhere.text;
