@@ -73,7 +73,7 @@ void KYTReportingBackend::tellOwner(DepartureKind kind, std::string_view address
                                     const URLReply& reply) const {
   if (!mayHaveLeft(reply.response, reply.error)) return;
   platform_.departures.add({.program = program_ != nullptr ? *program_ : ReportingProgram(),
-                            .server = std::string(serverOf(address)),
+                            .server = serverOf(address),
                             .kind = kind,
                             .events = 0,
                             .bytes = bytes,

@@ -78,7 +78,7 @@ void Outbox::tellOwner(const std::string& url, const OutboxBooks::Events& events
   for (const auto& [row, count] : events) all += count;
   for (const auto& [row, count] : events)
     ports_.departures.add({.program = row.program,
-                           .server = std::string(serverOf(url)),
+                           .server = serverOf(url),
                            .kind = DepartureKind::events,
                            .events = count,
                            .bytes = all != 0 ? bodyBytes * count / all : 0,

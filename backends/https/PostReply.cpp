@@ -64,7 +64,7 @@ void PostReply::tellOwner(const std::optional<URLResponse>& response,
     return;  // the outbox tells of its own
   for (const auto& [program, count] : posted->programs())
     platform.departures.add({.program = program,
-                             .server = std::string(serverOf(address)),
+                             .server = serverOf(address),
                              .kind = DepartureKind::events,
                              .events = count,
                              .bytes = bytes * count / posted->size(),

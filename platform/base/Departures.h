@@ -35,11 +35,15 @@ class NoDepartures final : public Departures {
   void add(const Departure&) override {}
 };
 
-// "https://host:port" of an address; the whole of what has no such form.
-[[nodiscard]] inline std::string_view serverOf(std::string_view url) {
+// "https://host:port" of an address, without a name and password before the host, which are for the server alone; the whole of
+// what has no such form.
+[[nodiscard]] inline std::string serverOf(std::string_view url) {
   const size_t scheme = url.find("://");
-  if (scheme == std::string_view::npos) return url;
-  return url.substr(0, url.find_first_of("/?#", scheme + 3));
+  if (scheme == std::string_view::npos) return std::string(url);
+  const size_t begin = scheme + 3;
+  std::string_view host = url.substr(begin, url.find_first_of("/?#", begin) - begin);
+  if (const size_t at = host.rfind('@'); at != std::string_view::npos) host.remove_prefix(at + 1);
+  return std::string(url.substr(0, begin)).append(host);
 }
 
 }  // namespace kyt

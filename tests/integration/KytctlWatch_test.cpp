@@ -213,6 +213,32 @@ TEST_F(KytctlWatch, WritesNothingThatATerminalObeys) {
   EXPECT_EQ(object(forPrograms.lines().at(0)).string("client")->str(), name);
 }
 
+// Who may watch may not see what is before the host of a post_url.
+TEST_F(KytctlWatch, TellsNoPasswordOfAServer) {
+  lay();
+  Dictionary client = entry("a");
+  std::string address = stage_->httpsBase() + "/events";
+  client.set("post_url", address.insert(address.find("://") + 3, "name:secret@"));
+  putBag("cadmor", {client});
+  startDaemon();
+  Running forPeople(root(), {"--bodies"}), forPrograms(root(), {"--json"});
+  ASSERT_TRUE(forPeople.shows("FATE")) << forPeople.text();
+  TestClient reporting(socket(), 7, "a");
+  ASSERT_EQ(reporting.configure(), "live: httppost");
+  // The other may come later.
+  EXPECT_TRUE(eventually([&] {
+    report(reporting, 5);
+    return !forPrograms.lines().empty();
+  }));
+  EXPECT_EQ(object(forPrograms.lines().at(0)).string("server")->str(), stage_->httpsBase());
+  EXPECT_TRUE(forPeople.shows(" to " + stage_->httpsBase())) << forPeople.text();
+  EXPECT_EQ(kytctl({"status", "--json"}).text.find("secret"), std::string::npos);
+  EXPECT_EQ(stage_->stopDaemon(std::chrono::seconds(30)).value_or(-1), 0);
+  const std::string owner = kytctl({"owner", "show", "--json"}).text;
+  EXPECT_NE(owner.find(stage_->httpsBase()), std::string::npos) << owner;
+  EXPECT_EQ(owner.find("secret"), std::string::npos) << owner;
+}
+
 TEST_F(KytctlWatch, LetsFourWatchAndTakesAnotherWhereOneHasGone) {
   lay();
   putBag("cadmor", {entry("a")});

@@ -39,7 +39,7 @@ WaitingPosts readFrom(const Paths& paths) {
   SQLitePostStore store(paths.outbox());
   const auto problem = store.open([&servers](const StoredPostHead& head) {
     if (head.isUnreadable) return;
-    WaitingPosts::Server& server = servers[std::string(serverOf(head.post.url))];
+    WaitingPosts::Server& server = servers[serverOf(head.post.url)];
     ++server.posts;
     server.bytes += head.bytes;
     if (server.oldest == 0) server.oldest = head.post.keptAt;
