@@ -93,12 +93,14 @@ class Reader : public ::testing::Test {
     natsConnection_Destroy(connection_);
   }
   [[nodiscard]] std::string url() const { return "nats://127.0.0.1:" + std::to_string(port_); }
-  void startReader(std::vector<std::string> further = {}, const std::string& database = "") {
+  void startReader(std::vector<std::string> further = {}, const std::string& database = "",
+                   std::vector<std::pair<std::string, std::string>> environment = {}) {
     std::vector<std::string> arguments = {"--server", url(), "--database",
                                           database.empty() ? postgres_->database() : database};
     arguments.insert(arguments.end(), further.begin(), further.end());
     tools::ChildProcess::Options how;
     how.outputFile = folder_ / "reader.log";
+    how.environment = std::move(environment);
     auto started = tools::ChildProcess::start(KYT_READER, arguments, how);
     ASSERT_TRUE(started);
     reader_ = std::move(*started);
@@ -189,6 +191,16 @@ TEST_F(Reader, StoresEachPostWithItsFactsAndItsEventsAsRows) {
   EXPECT_TRUE(eventually([this] { return unread() == 0; }));
 }
 
+// So no password has to stand in a command line, which every user of the machine can read.
+TEST_F(Reader, FindsTheDatabaseInAServiceFile) {
+  std::string entries = postgres_->database();
+  std::replace(entries.begin(), entries.end(), ' ', '\n');
+  const std::string file = folder_.write("services.conf", "[fleet]\n" + entries + "\n");
+  startReader({}, "service=fleet", {{"PGSERVICEFILE", file}});
+  put("a", gzipped(message(1)));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_posts", "1"));
+}
+
 TEST_F(Reader, LeavesRepeatsOutByTheirID) {
   startReader();
   for (int i = 0; i < 3; ++i) put("aa", gzipped(message(1)));
@@ -233,9 +245,10 @@ TEST_F(Reader, SetsAsideWhatCannotBeReadAndGoesOn) {
   put("zero", gzipped(R"({"events":[{"a":"\u0000"}]})"));
   put("bytes", gzipped("{\"events\":[{\"a\":\"\xff\"}]}"));
   put("other", "text", "br");
+  put("large", gzipped(R"({"events":[]})" + std::string(64 << 20, ' ')));
   put("", "who wrote this?");  // the library cannot read headers of which one is empty
   put("good-2", gzipped(message(2)));
-  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_unreadable", "7"));
+  EXPECT_TRUE(holds("SELECT count(*) FROM kyt_unreadable", "8"));
   EXPECT_TRUE(
       holds("SELECT string_agg(id, ' ' ORDER BY id) FROM kyt_posts", idOf("good-1") + " " + idOf("good-2")));
   EXPECT_EQ(postgres_->query("SELECT reason, body FROM kyt_unreadable WHERE id = '" + idOf("other") + "'"),

@@ -49,6 +49,18 @@ TEST_F(ReceiverTest, StoresARepeatOnce) {
   EXPECT_EQ(receiver_->metric("kyt_posts_total{result=\"stored\"}"), 3);
 }
 
+TEST_F(ReceiverTest, StoresABodyOnceThatComesToTwoPaths) {
+  ReceiverProcess::Options options;
+  options.path = "[[path]]\nurl_path = \"/v1/other\"\n";
+  start(options);
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_EQ(HttpConnection(receiver_->port()).post("/v1/other", postText(1)).status, 200);
+  EXPECT_EQ(view_->messages(), 1U);
+  EXPECT_EQ(view_->message(1)->headers.at("Kyt-Path"), "/v1/events");
+  EXPECT_EQ(HttpConnection(receiver_->port()).post("/v1/other", postText(2)).status, 200);
+  EXPECT_EQ(view_->message(2)->headers.at("Kyt-Path"), "/v1/other");
+}
+
 TEST_F(ReceiverTest, SpreadsPostsOverPartitions) {
   ReceiverProcess::Options options;
   options.log = "partitions = 4\n";
