@@ -501,7 +501,7 @@ TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilled) {
   EXPECT_GT(seen, 0U);
 }
 
-// Before each of the calls by which it takes up a file of the version before.
+// Before each of the calls by which it takes up a file of the version before; or the call fails, since the disk is full.
 TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilledAsItTakesUpAnEarlierVersion) {
   {
     SQLitePostStore store(folder_.path());
@@ -524,26 +524,28 @@ TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilledAsItTakesUpAnEar
   sqlite3_close(database);
   std::filesystem::rename(file, before);
   makeCallsFail();
-  int kills = 0;
+  int kills = 0, failures = 0;
   for (const char* call : {"open", "pwrite64", "ftruncate", "unlink", "fdatasync", "fsync"}) {
     bool isKilled = true;
-    for (int after = 0; isKilled; ++after) {
+    for (int after = 0; isKilled || after % 2 != 0; ++after) {
+      const bool isFull = after % 2 != 0;
       for (const char* end : {"", "-wal", "-journal"}) std::filesystem::remove(file + end);
       std::filesystem::copy_file(before, file);
       const pid_t child = ::fork();
       ASSERT_GE(child, 0);
       if (child == 0) {
-        fault = {.call = call, .after = after, .kills = true};
+        fault = {.call = call, .after = after / 2, .error = ENOSPC, .kills = !isFull};
         SQLitePostStore store(folder_.path());
-        const bool isRead = !store.open([](const StoredPostHead&) {});
+        const auto problem = store.open([](const StoredPostHead&) {});
         store.close();
-        ::_exit(isRead ? 0 : 1);
+        ::_exit(!problem ? 0 : problem->kind == PostStoreProblem::Kind::unavailable ? 1 : 2);
       }
       int status = 0;
       ASSERT_EQ(::waitpid(child, &status, 0), child);
-      isKilled = WIFSIGNALED(status);
-      ASSERT_TRUE(isKilled || WEXITSTATUS(status) == 0);
-      kills += isKilled ? 1 : 0;
+      if (!isFull) isKilled = WIFSIGNALED(status);
+      ASSERT_LE(WEXITSTATUS(status), isFull ? 1 : 0) << call << " " << after;
+      kills += !isFull && isKilled ? 1 : 0;
+      failures += WEXITSTATUS(status);
       SQLitePostStore store(folder_.path());
       std::vector<int64_t> there;
       const auto problem = store.open([&](const StoredPostHead& head) {
@@ -555,8 +557,9 @@ TEST_F(OutboxDiskTest, HasAllThatWasOnDiskWhenItsProcessIsKilledAsItTakesUpAnEar
       EXPECT_FALSE(store.setPauses({&pause, 1}));
     }
   }
-  std::printf("killed at %d calls\n", kills);
+  std::printf("killed at %d calls, unavailable at %d\n", kills, failures);
   EXPECT_GT(kills, 5);
+  EXPECT_GT(failures, 2);
 }
 
 }  // namespace
