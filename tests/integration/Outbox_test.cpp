@@ -5,6 +5,7 @@
 #include <thread>
 
 #include "tests/integration/OutboxDaemonFixture.h"
+#include "tests/support/Sanitizers.h"
 
 namespace kyt {
 namespace {
@@ -50,6 +51,34 @@ TEST_F(OutboxOfTheDaemon, WithoutTheSettingIsNeitherFileNorThreadNorLibrary) {
   EXPECT_FALSE(std::filesystem::exists(folder()));
   EXPECT_FALSE(hasThread("kyt-outbox"));
   EXPECT_EQ(ofProcess("maps").find("sqlite"), std::string::npos);
+}
+
+TEST_F(OutboxOfTheDaemon, WithoutTheSettingMakesNoCallOfTheSystemForIt) {
+  if (kSanitized) GTEST_SKIP() << "the leak sanitizer cannot run where another traces";
+  if (runProgram("strace", {"-D", "-f", "-o", "/dev/null", "true"}).status != 0)
+    GTEST_SKIP() << "no strace here";
+  const std::string calls = daemon_.root() / "calls";
+  const auto callsThatNameIt = [&](const char* setting) {
+    settings(setting);
+    daemon_.setLauncher({"strace", "-D", "-f", "-s", "64", "-o", calls});
+    start();
+    TestClient client(daemon_.socketPath(), kTorvel, "plain");
+    EXPECT_EQ(client.configure(), "live: httppost") << daemon_.log();
+    EXPECT_TRUE(client.send(9, 1, Dictionary{}));
+    static_cast<void>(client.flush());
+    end();
+    std::string found;
+    std::ifstream lines(calls);
+    for (std::string line; std::getline(lines, line);) {
+      const bool names = line.find("sqlite") != std::string::npos ||
+                         line.find("kyt-outbox") != std::string::npos ||
+                         line.find("kytreportingd/outbox") != std::string::npos;
+      if (names) found += line + "\n";
+    }
+    return found;
+  };
+  EXPECT_EQ(callsThatNameIt(""), "");
+  EXPECT_NE(callsThatNameIt(kOn), "");
 }
 
 TEST_F(OutboxOfTheDaemon, LoadsNothingWhileAllPostsArrive) {
