@@ -12,7 +12,7 @@ is lost without being counted: see Session.statistics().
 
 Every operation may be called from any thread. After os.fork() the child goes on with a session of its own, opened at
 its first use. What is queued when the program ends is sent, for a second at most, and so is what a process of
-multiprocessing (fork or spawn) queued whose function returned; os._exit() and a signal lose what is queued.
+multiprocessing (fork, spawn or forkserver) queued whose function returned; os._exit() and a signal lose what is queued.
 
 The page "Reporting from a program" has the whole story: PROGRAMS.md in the documents of libkytreporting-dev.
 """

@@ -12,7 +12,7 @@ import itertools
 import threading
 from typing import Any, Callable, Dict, List, Optional, TypeVar
 
-from ._errors import TimedOutError, error_of
+from ._errors import InvalidError, TimedOutError, error_of
 from ._library import STATES_CALLBACK, SUCCESS_CALLBACK, TEXT_CALLBACK, lib
 
 T = TypeVar("T")
@@ -45,6 +45,8 @@ def wait(future: "concurrent.futures.Future[T]", timeout: Optional[float]) -> T:
     """The answer, or its error. None waits as long as the library does."""
     if getattr(within, "callback", False) and not future.done():
         raise RuntimeError("a callback runs on the thread that would bring the answer: it may not wait for one")
+    if timeout is not None and not isinstance(timeout, (int, float)):
+        raise InvalidError(f"timeout must be a number of seconds, not a value of the type {type(timeout).__name__}")
     try:
         return future.result(timeout)
     except concurrent.futures.TimeoutError as late:

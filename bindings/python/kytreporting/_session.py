@@ -26,7 +26,7 @@ from ._errors import ClosedError, Error, InvalidError, error_of
 from ._library import AGGREGATION_CALLBACK, STATE_CALLBACK, Figures, Options, lib
 from ._statistics import Statistics, statistics_of
 from ._timing import Counter, Timer
-from ._values import Array, Dictionary, Payload, text_bytes
+from ._values import Array, Dictionary, Payload, checked_mapping, checked_number, text_bytes
 
 _REASON_BYTES = 512
 _MOST_SECONDS = 4_294_967  # 49 days: 32 bits of milliseconds
@@ -132,18 +132,28 @@ def _path_bytes(path: Union[str, "os.PathLike[str]"]) -> bytes:
 
 def _milliseconds(what: str, seconds: float) -> int:
     """Whole ones, and at least one of what is not 0: for the library 0 has a meaning of its own."""
+    if not isinstance(seconds, (int, float)):
+        raise InvalidError(f"{what} must be a number of seconds, not a value of the type {type(seconds).__name__}")
     if not 0 <= seconds <= _MOST_SECONDS:
         raise InvalidError(f"{what}: {seconds} is no number of seconds from 0 to {_MOST_SECONDS}")
     return math.ceil(seconds * 1000)
 
 
 def _checked(information: Mapping[str, Any]) -> None:
+    for key, value in information.items():
+        if value is None:  # which would be left out: of the consent's reach, for one
+            raise InvalidError(f'session information: "{key}" is None')
     with Dictionary(information) as dictionary:
         if not lib.kyt_session_info_check(dictionary.pointer, _places.text, _REASON_BYTES):
             raise InvalidError(_places.read())
 
 
 def _names(client: Optional[str], service: Optional[str], more: Optional[Payload]) -> Optional[Dict[str, Any]]:
+    if more is not None:
+        checked_mapping("user_info", more)
+    for what, name in (("client", client), ("service", service)):
+        if name is not None and not isinstance(name, str):
+            raise InvalidError(f"{what} must be a text, not a value of the type {type(name).__name__}")
     user: Dict[str, Any] = dict(more or {})
     if client is not None:
         user["ClientName"] = client
@@ -202,6 +212,11 @@ class Session:
         wait_for_daemon: bool = True,
         configure: bool = True,
     ) -> None:
+        for what, function in (("on_state_change", on_state_change), ("on_aggregated", on_aggregated)):
+            if function is not None and not callable(function):
+                raise InvalidError(f"{what} must be a function, not a value of the type {type(function).__name__}")
+        if hierarchy is not None and not (isinstance(hierarchy, (tuple, list)) and len(hierarchy) == 2):
+            raise InvalidError("hierarchy must be a token and a level")
         self._information: Dict[str, Any] = {
             "SessionID": secrets.randbits(32) if session_id is None else session_id,
             "ClientType": client_type,
@@ -214,9 +229,8 @@ class Session:
         _checked(self._information)
         self._user = _names(client, service, user_info)
         self._socket = None if socket is None else _path_bytes(socket)
-        for bound in (max_queued_messages, max_queued_bytes):
-            if not 0 <= bound < 2**63:
-                raise InvalidError(f"a bound of {bound}: the queue holds a number of messages and bytes")
+        checked_number("the bound max_queued_messages", max_queued_messages, 0, 2**63 - 1)
+        checked_number("the bound max_queued_bytes", max_queued_bytes, 0, 2**63 - 1)
         self._bounds = (max_queued_messages, max_queued_bytes)
         self._told = on_state_change
         self._aggregates = on_aggregated
@@ -320,6 +334,7 @@ class Session:
         The payload is a mapping, keywords, or both. What reaches a server are texts, numbers, booleans and dates. Raises
         InvalidError for what cannot be meant so, ClosedError after the end. Does not wait for anything.
         """
+        checked_number("flag", flag, 0, 3)
         with _message(category, type, payload, fields) as dictionary:
             problem = lib.kyt_session_try_send(
                 self._handle(), category, type, dictionary.pointer, flag, _places.text, _REASON_BYTES
@@ -353,6 +368,7 @@ class Session:
     def _reply(
         self, category: int, type: int, payload: Optional[Payload], fields: Mapping[str, Any], flag: int
     ) -> "concurrent.futures.Future[Optional[str]]":
+        checked_number("flag", flag, 0, 3)
         with _message(category, type, payload, fields) as dictionary:
             handle = self._handle()
             number, future = _calls.begin()
@@ -399,6 +415,7 @@ class Session:
 
     def _states(self, user_info: Optional[Payload]) -> "concurrent.futures.Future[Optional[List[str]]]":
         if user_info is not None:
+            checked_mapping("user_info", user_info)
             self._user = dict(user_info)
         with Dictionary(self._user) as user:
             number, future = self._begin()
@@ -460,6 +477,8 @@ class Session:
         return await asyncio.wrap_future(self._upload_data(log_data))
 
     def _upload_data(self, log_data: Sequence[Any]) -> "concurrent.futures.Future[bool]":
+        if not isinstance(log_data, (list, tuple)):
+            raise InvalidError(f"log_data must be a list, not a value of the type {type(log_data).__name__}")
         with Array(log_data) as array:
             number, future = self._begin()
             lib.kyt_session_upload_log_data(self._handle(), array.pointer, _calls.on_success, number)
@@ -473,6 +492,8 @@ class Session:
 
     def update_shared_data(self, entries: Optional[Payload] = None, /, **more: Any) -> None:
         """What goes into the records of all sessions of the hierarchy."""
+        if entries is not None:
+            checked_mapping("entries", entries)
         merged = {**(entries or {}), **more}
         with Dictionary(merged) as dictionary:
             lib.kyt_session_update_shared_data(self._handle(), dictionary.pointer)
@@ -480,11 +501,17 @@ class Session:
 
     def remove_shared_data(self, key: str) -> None:
         """Takes one entry of it back."""
+        if not isinstance(key, str):
+            raise InvalidError(f"a key of the type {type(key).__name__}: keys are texts")
         lib.kyt_session_remove_shared_data(self._handle(), text_bytes(key))
         self._shared.pop(key, None)
 
     def set_digest_key(self, key: bytes, algorithm: int = 0) -> None:
         """Key of the digests of the posts of the back end "qrs"; algorithm 0 is HMAC-SHA1."""
+        if not isinstance(key, (bytes, bytearray)):
+            raise InvalidError(f"key must be bytes, not a value of the type {type(key).__name__}")
+        checked_number("algorithm", algorithm, -(2**31), 2**31 - 1)
+        key = bytes(key)
         lib.kyt_session_set_digest_key(self._handle(), key, len(key), algorithm)
         self._digest = (key, algorithm)
 
@@ -521,6 +548,8 @@ class Session:
 
         Gives up at once where no daemon ever took anything and none is there. False also when it has ended before.
         """
+        if not isinstance(timeout, (int, float)):
+            raise InvalidError(f"timeout must be a number of seconds, not a value of the type {type(timeout).__name__}")
         milliseconds = _milliseconds("timeout", min(max(0.0, timeout), _MOST_SECONDS))
         if self._pointer is None and (self._ended or not self._has_sums()):  # nothing was sent in this forked child
             self._ended = True
@@ -578,6 +607,7 @@ def _message(category: int, type: int, payload: Optional[Payload], fields: Mappi
             raise InvalidError(f"category {category}, type {type}: both are whole numbers from 0 to 65535")
     if payload is None:
         return Dictionary(fields)
+    checked_mapping("payload", payload)
     return Dictionary({**payload, **fields} if fields else payload)
 
 
@@ -680,6 +710,12 @@ def _at_exit() -> None:
         lib.kyt_close_all()
 
 
+def _is_of_a_forkserver() -> bool:
+    """Such a process was forked before it imported this module, and ends without what atexit has. Its arguments are those
+    of its server."""
+    return any("multiprocessing.forkserver" in text for text in getattr(sys, "orig_argv", ()))
+
+
 def _finish_with_process(_: object = None) -> None:
     """A process of multiprocessing ends by os._exit(), and does before it what is registered with it."""
     if _program.watches_process != os.getpid():
@@ -698,4 +734,7 @@ def _after_fork_in_child() -> None:
 
 
 atexit.register(_at_exit)
+if _is_of_a_forkserver() and "multiprocessing.util" in sys.modules:
+    # What is to be done at its end is forgotten once more before its work begins.
+    sys.modules["multiprocessing.util"].register_after_fork(_program, _finish_with_process)
 os.register_at_fork(after_in_child=_after_fork_in_child)

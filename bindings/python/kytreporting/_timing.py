@@ -11,7 +11,7 @@ from types import TracebackType
 from typing import TYPE_CHECKING, Any, Callable, Dict, Optional, Tuple, Type, TypeVar, cast
 
 from ._errors import InvalidError
-from ._values import Dictionary
+from ._values import Dictionary, checked_number
 
 if TYPE_CHECKING:
     from ._session import Session
@@ -28,6 +28,9 @@ class _Measure:
     program's own work is to fail for what is measured of it."""
 
     def __init__(self, session: "Session", category: int, type: int, fields: Dict[str, Any]) -> None:
+        for number in (category, type):
+            if not isinstance(number, int):
+                raise InvalidError("category and type are whole numbers")
         if not (0 <= category <= 0xFFFF and 0 <= type <= 0xFFFF):
             raise InvalidError(f"category {category} and type {type}: both are 0 to 65535")
         with Dictionary(fields):
@@ -143,6 +146,7 @@ class Counter(_Measure):
 
     def __init__(self, session: "Session", category: int, type: int, /, *, interval: float = 60.0, **fields: Any) -> None:
         super().__init__(session, category, type, fields)
+        checked_number("interval", interval, 0, 2**53, whole=False)
         self._interval = interval
         self._start_anew()
 

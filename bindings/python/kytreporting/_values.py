@@ -23,11 +23,31 @@ def text_bytes(value: str) -> bytes:
     return value.encode("utf-8", "replace")
 
 
+def checked_mapping(what: str, value: Any) -> None:
+    """Raises for what is no mapping, and names what was given."""
+    if not isinstance(value, Mapping):
+        raise InvalidError(f"{what} must be a mapping, not a value of the type {type(value).__name__}")
+
+
+def checked_number(what: str, value: Any, low: float, high: float, whole: bool = True) -> None:
+    """Raises for what is no number of that range, and names what was given."""
+    if not isinstance(value, int if whole else (int, float)):
+        kind = "whole number" if whole else "number"
+        raise InvalidError(f"{what} must be a {kind}, not a value of the type {type(value).__name__}")
+    if not low <= value <= high:
+        raise InvalidError(f"{what} must be from {low} to {high}, not {_shown(value) if isinstance(value, int) else value}")
+
+
 def _seconds(value: datetime.datetime) -> float:
     try:
         return value.timestamp()
     except (OverflowError, ValueError, OSError) as error:  # the local time's year 0, for one
         raise InvalidError(f"the date {value} cannot be sent: {error}") from None
+
+
+def _shown(value: int) -> str:
+    """Python refuses to write a number of thousands of digits."""
+    return str(value) if value.bit_length() < 1000 else f"a number of {value.bit_length()} bits"
 
 
 def _unknown(value: object) -> InvalidError:
@@ -96,7 +116,7 @@ def _put(library: Any, prefix: str, where: Sequence[Any], value: Any, depth: int
         put("bool", value)
     elif isinstance(value, int):
         if not -(2**63) <= value < 2**64:
-            raise InvalidError(f"{value}: whole numbers have 64 bits")
+            raise InvalidError(f"{_shown(value)}: whole numbers have 64 bits")
         put("int" if value < 2**63 else "uint", value)
     elif isinstance(value, float):
         put("double", value)

@@ -127,3 +127,25 @@ def test_a_program_that_is_interrupted_as_it_ends_hears_nothing_any_more(kyt_lis
         """
     )
     assert said == "interrupted\nthe program ends\n"
+
+
+def test_ctrl_c_ends_the_waiting_for_an_answer(program, tmp_path):
+    said = program(
+        """
+        import os, signal, threading, time
+        import kytreporting as kyt
+        session = kyt.Session(20, call_deadline=0)
+        def interrupt():
+            time.sleep(0.01)
+            os.kill(os.getpid(), signal.SIGINT)
+        for wait in (session.flush, session.configure, session.fetch_display_url):
+            threading.Thread(target=interrupt).start()
+            try:
+                wait()
+            except KeyboardInterrupt:
+                print("interrupted")
+        session.close()
+        """,
+        KYTREPORTING_SOCKET=str(tmp_path / "none"),
+    )
+    assert said == "interrupted\n" * 3

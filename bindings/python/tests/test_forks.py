@@ -162,7 +162,7 @@ def test_a_child_has_a_random_session_id_of_its_own(kyt_listener, program):
     assert first["sessionInfo"]["SessionID"] != second["sessionInfo"]["SessionID"]
 
 
-@pytest.mark.parametrize("method", ["fork", "spawn"])
+@pytest.mark.parametrize("method", ["fork", "spawn", "forkserver"])
 def test_what_a_process_of_multiprocessing_queued_is_sent_at_its_end(kyt_listener, tmp_path, method):
     path = tmp_path / "report.py"
     path.write_text(
@@ -199,3 +199,44 @@ def test_a_sum_alone_leaves_with_a_process_of_multiprocessing(kyt_listener, prog
         """
     )
     assert kyt_listener.wait_for("message")[0]["payload"]["count"] == 1
+
+
+@pytest.mark.parametrize("method", ["fork", "spawn", "forkserver"])
+def test_a_pool_that_is_closed_and_joined_sends_all(kyt_listener, tmp_path, method):
+    path = tmp_path / "report.py"
+    path.write_text(
+        "import multiprocessing\n"
+        "import kytreporting as kyt\n"
+        "session = kyt.Session(20)\n"
+        "def work(number):\n"
+        "    session.send(1, number)\n"
+        "if __name__ == '__main__':\n"
+        f"    pool = multiprocessing.get_context('{method}').Pool(2)\n"
+        "    pool.map(work, range(50))\n"
+        "    pool.close()\n"
+        "    pool.join()\n"
+    )
+    subprocess.run([sys.executable, str(path)], check=True, timeout=60)
+    assert sorted(m["type"] for m in kyt_listener.wait_for("message", 50)) == list(range(50))
+
+
+def test_what_a_child_queued_before_os_exit_is_lost_unless_it_finishes(kyt_listener, program):
+    kyt_listener.stop()  # what is queued cannot leave before the child has ended
+    said = program(
+        """
+        import os
+        import kytreporting as kyt
+        session = kyt.Session(20)
+        for finishes in (False, True):
+            child = os.fork()
+            if child == 0:
+                session.send(1, 1)
+                if finishes:
+                    print(session.finish(), session.statistics().lost_in_queue, flush=True)
+                os._exit(0)
+            os.waitpid(child, 0)
+        """
+    )
+    assert said == "False 1\n"
+    kyt_listener.start()
+    assert not kyt_listener.events("message")

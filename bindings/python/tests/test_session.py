@@ -31,7 +31,7 @@ def test_a_session_tells_who_it_is_and_reports(kyt_listener):
 
 
 def test_answers_come_back(kyt_listener):
-    with kyt.Session(20, "x") as session:
+    with kyt.Session(20, "x", batch=True) as session:
         assert session.configure() == ["httppost"]
         assert session.state is kyt.State.LIVE
         assert session.state_reason == "httppost"
@@ -39,11 +39,19 @@ def test_answers_come_back(kyt_listener):
         assert session.fetch_display_url() == "URL not available"
         assert session.send_with_reply(1, 2, a=1) is None
         assert session.flush() is None
-        assert session.upload_log_data(["line", 2, {"a": [1.5]}])
-        assert session.upload_file(__file__)
+        assert not session.upload_log_data(["line", 2, {"a": [1.5]}])  # no back end for it
+        assert not session.upload_file(__file__)
     kyt_listener.wait_for("end")
     assert kyt_listener.events("states")[0]["userInfo"] == {"ClientName": "z"}
     assert kyt_listener.events("logData")[0]["logData"] == ["line", 2, {"a": [1.5]}]
+
+
+def test_the_back_end_for_files_takes_files_and_log_data(monkeypatch):
+    with Listener(live="httppost,uploadserver") as listener:
+        monkeypatch.setenv("KYTREPORTING_SOCKET", listener.socket_path)
+        with kyt.Session(20) as session:
+            assert session.upload_log_data(["line"])
+            assert session.upload_file(__file__)
 
 
 def test_errors_have_the_librarys_texts(kyt_listener):
@@ -143,7 +151,7 @@ def test_asyncio_waits_without_blocking_the_loop(kyt_listener):
                 await asyncio.sleep(0)
 
         ticking = asyncio.create_task(tick())
-        async with kyt.Session(20) as session:
+        async with kyt.Session(20, batch=True) as session:
             assert await session.afetch_states() == ["httppost"]
             session.send(1, 1)
             before = ticks
@@ -154,8 +162,8 @@ def test_asyncio_waits_without_blocking_the_loop(kyt_listener):
             assert await session.asend_with_reply(1, 2) is None
             assert await session.aconfigure() == ["httppost"]
             assert await session.afetch_display_url() == "URL not available"
-            assert await session.aupload_file(__file__)
-            assert await session.aupload_log_data(["line"])
+            assert not await session.aupload_file(__file__)  # no back end for it
+            assert not await session.aupload_log_data(["line"])
             assert await kyt.asend_single(1, 2, client_type=20, client="x", a=1) == "finished"
             before = ticks
             assert await session.afinish()

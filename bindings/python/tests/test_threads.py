@@ -37,7 +37,7 @@ def test_answers_come_while_other_threads_hold_the_interpreter(kyt_listener):
     spinning = threading.Thread(target=spin)
     spinning.start()
     try:
-        with kyt.Session(20) as session:
+        with kyt.Session(20, batch=True) as session:
             for _ in range(20):
                 session.send(1, 1)
                 assert session.flush(30) is None

@@ -147,3 +147,53 @@ def test_a_deadline_below_a_millisecond_is_a_deadline(tmp_path):
     with pytest.raises(kyt.TimedOutError, match="no daemon within"):
         session.flush(timeout=20)
     session.close()
+
+
+@pytest.mark.parametrize(
+    "call, text",
+    [
+        (lambda session: session.send(1, 1, [1]), "payload must be a mapping, not a value of the type list"),
+        (lambda session: session.send(1, 1, 5, a=1), "payload must be a mapping, not a value of the type int"),
+        (lambda session: session.send(1, 1, a=10**5000), "a number of 16610 bits: whole numbers have 64 bits"),
+        (lambda session: session.send(1, 1, flag="x"), "flag must be a whole number"),
+        (lambda session: session.send(1, 1, flag=2**40), "flag must be from 0 to 3"),
+        (lambda session: session.send_with_reply(1, 1, flag=-1), "flag must be from 0 to 3"),
+        (lambda session: session.upload_log_data("text"), "log_data must be a list"),
+        (lambda session: session.update_shared_data([1]), "entries must be a mapping"),
+        (lambda session: session.remove_shared_data(5), "a key of the type int"),
+        (lambda session: session.set_digest_key("x"), "key must be bytes"),
+        (lambda session: session.set_digest_key(b"x", 2**40), "algorithm must be from"),
+        (lambda session: session.fetch_states([1]), "user_info must be a mapping"),
+        (lambda session: session.flush(timeout="1"), "timeout must be a number of seconds"),
+        (lambda session: session.finish(None), "timeout must be a number of seconds"),
+        (lambda session: session.timed("x", 1), "category and type are whole numbers"),
+        (lambda session: session.counter(1, 1, interval="x"), "interval must be a number"),
+    ],
+)
+def test_an_argument_of_a_wrong_type_is_named(kyt_listener, call, text):
+    with kyt.Session(20) as session:
+        with pytest.raises(kyt.InvalidError, match=text):
+            call(session)
+        assert session.statistics().accepted == 0
+
+
+@pytest.mark.parametrize(
+    "arguments, text",
+    [
+        ({"client_type": None}, '"ClientType" is None'),
+        ({"require_user_info": None}, '"RequireUserInfo" is None'),
+        ({"batch": None}, '"BatchEvent" is None'),
+        ({"client": 5}, "client must be a text, not a value of the type int"),
+        ({"service": b"x"}, "service must be a text, not a value of the type bytes"),
+        ({"user_info": [1]}, "user_info must be a mapping"),
+        ({"hierarchy": "x"}, "hierarchy must be a token and a level"),
+        ({"on_state_change": 5}, "on_state_change must be a function"),
+        ({"on_aggregated": "x"}, "on_aggregated must be a function"),
+        ({"max_queued_messages": 64.5}, "max_queued_messages must be a whole number"),
+        ({"call_deadline": "x"}, "call_deadline must be a number of seconds"),
+        ({"flush_interval": None}, "flush_interval must be a number of seconds"),
+    ],
+)
+def test_a_session_names_its_argument_of_a_wrong_type(arguments, text):
+    with pytest.raises(kyt.InvalidError, match=text):
+        kyt.Session(**{"client_type": 20, **arguments})
