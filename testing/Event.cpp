@@ -15,6 +15,7 @@ void describeMessage(Dictionary& line, const Event& event) {
   line.set("type", static_cast<unsigned>(event.type));
   line.set("flag", event.flag);
   line.set("payload", event.payload);
+  if (event.dropped) line.set("dropped", true);
   if (!event.single) return;
   line.set("sessionInfo", event.sessionInfo);
   setUserInfo(line, event.userInfo);

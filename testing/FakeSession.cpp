@@ -1,11 +1,17 @@
 #include "testing/FakeSession.h"
 
+#include <algorithm>
 #include <utility>
 
+#include "config/ClientTypes.h"
 #include "platform/base/Hex.h"
 #include "platform/objects/Keys.h"
 
 namespace kyt::testing {
+
+namespace {
+constexpr uint32_t kRealtime = 1;  // of a message's flags
+}  // namespace
 
 Event FakeSession::event(Kind kind) const {
   Event made;
@@ -14,26 +20,41 @@ Event FakeSession::event(Kind kind) const {
   return made;
 }
 
+bool FakeSession::hasStorebag(const Dictionary& info) const {
+  return states_ && storebagNameForClientType(info.integer(kKYTReportingSessionInfoClientType)).has_value();
+}
+
+bool FakeSession::takesUploads() const {
+  return isConfigured_ && std::ranges::any_of(*states_, [](const Value& name) {
+           return name.string() != nullptr && *name.string() == kKYTReportingBackendUploadServer;
+         });
+}
+
 void FakeSession::setSessionInfo(Dictionary info, std::optional<Dictionary> user, Value /*frameworks*/,
                                  bool aggregates) {
   Event made = event(Kind::session);
   made.sessionInfo = std::move(info);
   made.userInfo = std::move(user);
   made.aggregates = aggregates;
+  hasStorebag_ = hasStorebag(made.sessionInfo);
+  batches_ = made.sessionInfo.boolean(kKYTReportingSessionInfoBatchEvent);
   aggregators_->add(made, connection_);
   note(std::move(made));
 }
 
 void FakeSession::startConfigWithCompletionHandler(StatesReply reply) {
   if (!note(event(Kind::configuration))) return keep(std::move(reply));
-  reply(states_);
+  isConfigured_ = isConfigured_ || hasStorebag_;
+  // The session's start message is an event like others.
+  pending_ = isConfigured_ && !states_->empty() && batches_;
+  reply(hasStorebag_ ? states_ : std::nullopt);
 }
 
 void FakeSession::fetchStatesWithUserInfo(std::optional<Dictionary> user, StatesReply reply) {
   Event made = event(Kind::states);
   made.userInfo = std::move(user);
   if (!note(std::move(made))) return keep(std::move(reply));
-  reply(states_);
+  reply(isConfigured_ ? states_ : std::nullopt);
 }
 
 void FakeSession::fetchDisplayURL(StringReply reply) {
@@ -48,9 +69,11 @@ void FakeSession::sendMessageWithDictionary(Dictionary message, ObjectReply repl
   made.flag = message.unsignedInteger(kKYTReportingMessageParametersFlag);
   if (const Dictionary* payload = message.dictionary(kKYTReportingMessageParametersPayload))
     made.payload = *payload;
-  pending_ = true;
+  made.dropped = !isConfigured_;
+  const bool isRealtime = (made.flag & kRealtime) != 0;  // what was batched goes before it
+  pending_ = !isRealtime && (pending_ || (isConfigured_ && !states_->empty() && batches_));
   const bool noted = note(made);
-  if (noted) aggregators_->offer(made);
+  if (noted && !made.dropped) aggregators_->offer(made);
   if (!reply) return;
   if (!noted || !records_->isAlive()) return keep(std::move(reply));
   reply(Value());
@@ -58,6 +81,8 @@ void FakeSession::sendMessageWithDictionary(Dictionary message, ObjectReply repl
 
 void FakeSession::flushMessagesWithCompletion(ResultReply completion) {
   if (!note(event(Kind::flush))) return keep(std::move(completion));
+  if (!isConfigured_)
+    return completion(Value(), Error{kKYTReportingErrorDomain, -1, "No backends available to send message"});
   if (std::exchange(pending_, false)) return completion(Value(), std::nullopt);
   completion(Value(), Error{kKYTReportingErrorDomain, -1, "Nothing to flush"});
 }
@@ -71,14 +96,14 @@ void FakeSession::uploadFileAtPath(String url, String /*token*/, std::optional<F
   Event made = event(Kind::file);
   made.text = url.str();
   if (!note(std::move(made))) return keep(std::move(reply));
-  reply(extension.has_value());
+  reply(extension.has_value() && takesUploads());
 }
 
 void FakeSession::uploadLogData(Value data, SuccessErrorReply reply) {
   Event made = event(Kind::logData);
   made.payload.set("logData", std::move(data));
   if (!note(std::move(made))) return keep(std::move(reply));
-  reply(true, std::nullopt);
+  reply(takesUploads(), std::nullopt);
 }
 
 void FakeSession::sendMessageWithSessionInfo(Dictionary info, std::optional<Dictionary> user,
@@ -90,15 +115,17 @@ void FakeSession::sendMessageWithSessionInfo(Dictionary info, std::optional<Dict
     if (reply) reply("Could not retrieve identifiers from sessionInfo");
     return;
   }
+  const bool finds = hasStorebag(info);
   Event made = event(Kind::message);
   made.single = true;
+  made.dropped = !finds;
   made.category = category;
   made.type = type;
   made.sessionInfo = std::move(info);
   made.userInfo = std::move(user);
   if (payload) made.payload = *std::move(payload);
   if (!note(std::move(made)) || !records_->isAlive()) return keep(std::move(reply));
-  reply(states_ ? "finished" : "storebag not available");
+  reply(finds ? "finished" : "storebag not available");
 }
 
 void FakeSession::updateSharedDataWithDictionary(Dictionary data) {

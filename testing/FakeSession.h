@@ -43,6 +43,8 @@ class FakeSession final : public ClientSessionInterface {
 
  private:
   [[nodiscard]] Event event(Kind kind) const;
+  [[nodiscard]] bool hasStorebag(const Dictionary& info) const;
+  [[nodiscard]] bool takesUploads() const;  // one of the back ends is for files and log data
   // False: the daemon is dead.
   bool note(Event event) const { return records_->add(std::move(event)); }
   // Of a dead daemon: an answer that is dropped would be an error, so it is kept until the connection is gone.
@@ -56,7 +58,10 @@ class FakeSession final : public ClientSessionInterface {
   const std::shared_ptr<Records> records_;          // with the other connections, and the daemon
   const std::shared_ptr<Aggregators> aggregators_;  // likewise
   const std::optional<Array> states_;
-  bool pending_ = false;  // messages came since the last flush
+  bool hasStorebag_ = false;   // its client type has one
+  bool isConfigured_ = false;  // it has back ends
+  bool batches_ = false;
+  bool pending_ = false;  // messages were batched since the last flush
 };
 
 }  // namespace kyt::testing

@@ -19,7 +19,7 @@ using testing::Kind;
 std::unique_ptr<KYTReporting> sessionOn(const FakeDaemon& daemon) {
   KYTReporting::Options options;
   options.socketPath = daemon.socketPath();
-  options.sessionInfo = SessionInfo{.sessionID = 5, .clientType = 20};
+  options.sessionInfo = SessionInfo{.sessionID = 5, .clientType = 20, .batchEvent = true};
   options.userInfo = Dictionary{{kKYTReportingUserInfoClientName, "x"}};
   return KYTReporting::open(std::move(options));
 }
@@ -46,7 +46,7 @@ TEST(FakeDaemonOfTests, KeepsWhatAProgramTellsIt) {
   EXPECT_EQ(configured(*session), std::vector<std::string>{"httppost"});
   session->updateSharedData("key", 1);
   session->setDigestKey(Data("\x01\xff"), 0);
-  EXPECT_TRUE(session->sendMessage(10, 1, {{"step", 1}}, 3));
+  EXPECT_TRUE(session->sendMessage(10, 1, {{"step", 1}}, 2));
   EXPECT_EQ(flushed(*session), "");
   EXPECT_EQ(flushed(*session), "Nothing to flush");
   EXPECT_TRUE(session->finish(std::chrono::seconds(30)));
@@ -65,7 +65,7 @@ TEST(FakeDaemonOfTests, KeepsWhatAProgramTellsIt) {
   const Event message = daemon.events(Kind::message)[0];
   EXPECT_EQ(message.payload, (Dictionary{{"step", 1}}));
   EXPECT_EQ(description(message.dictionary()),
-            R"({"event":"message","connection":1,"category":10,"type":1,"flag":3,"payload":{"step":1}})");
+            R"({"event":"message","connection":1,"category":10,"type":1,"flag":2,"payload":{"step":1}})");
 }
 
 TEST(FakeDaemonOfTests, DropsASingleMessageWithoutIdentifiersAsTheDaemonDoes) {
@@ -85,7 +85,7 @@ TEST(FakeDaemonOfTests, DropsASingleMessageWithoutIdentifiersAsTheDaemonDoes) {
 }
 
 TEST(FakeDaemonOfTests, TakesSingleMessagesAndUploads) {
-  FakeDaemon daemon;
+  FakeDaemon daemon({.socketPath = {}, .live = {"httppost", "uploadserver"}, .onEvent = nullptr});
   ASSERT_EQ(daemon.start(), std::nullopt);
   KYTReporting::Options options;
   options.socketPath = daemon.socketPath();
@@ -98,6 +98,7 @@ TEST(FakeDaemonOfTests, TakesSingleMessagesAndUploads) {
   EXPECT_TRUE(daemon.events(Kind::message)[0].single);
   const TemporaryFolder folder;
   const auto session = sessionOn(daemon);
+  EXPECT_EQ(configured(*session), (std::vector<std::string>{"httppost", "uploadserver"}));
   std::promise<bool> taken;
   session->uploadFile(folder.write("report.log", "x"),
                       [&taken](bool success, const std::optional<Error>&) { taken.set_value(success); });
@@ -167,6 +168,7 @@ TEST(FakeDaemonOfTests, GivesMessagesToTheTopMostSessionThatAggregates) {
     KYTReporting::Options options;
     options.socketPath = daemon.socketPath();
     options.sessionInfo = Dictionary{{"SessionID", level},
+                                     {"ClientType", 20},
                                      {"HierarchyToken", Dictionary{{"TokenID", token}, {"Level", level}}}};
     if (aggregates)
       options.aggregationBlock = [&, level](const AggregatedMessage& message) {
@@ -175,7 +177,9 @@ TEST(FakeDaemonOfTests, GivesMessagesToTheTopMostSessionThatAggregates) {
                            std::to_string(message.sessionInfo->unsignedInteger("SessionID")) + ": " +
                            std::to_string(message.category) + " " + description(*message.payload));
       };
-    return KYTReporting::open(std::move(options));
+    auto session = KYTReporting::open(std::move(options));
+    session->startConfiguration();
+    return session;
   };
   const auto top = open("a", 1, true), middle = open("a", 2, true), lowest = open("a", 3, false),
              above = open("a", 0, false), stranger = open("b", 4, false);

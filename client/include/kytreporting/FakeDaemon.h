@@ -1,7 +1,10 @@
 // libkytreporting-testing: a daemon in the test of a program that reports. It listens on a socket of its own, speaks what
 // the real one speaks, and keeps what it was told: no entitlement, no storebag, no network. Nothing leaves it. A session
 // that aggregates gets its own messages and those of the sessions beneath it in its hierarchy, as from the real one, but no
-// starts and ends of sessions.
+// starts and ends of sessions. It answers as the real one does where all is well: client types 0 to 4 have no storebag, a
+// session has no back ends before it is configured, only what is batched can be flushed, and only the back end "uploadserver"
+// takes files and log data. It knows no entries of storebags: consent, promised user information, lists, sampling, filters
+// and servers' answers are for the real one (kytdemo --stage).
 //
 //   kyt::testing::FakeDaemon daemon;                      // or with Options
 //   ASSERT_EQ(daemon.start(), std::nullopt);
@@ -54,6 +57,7 @@ struct Event {
   uint32_t flag = 0;        // 0 to 3
   bool single = false;      // a message without a session
   bool aggregates = false;  // of a session: it wants its descendants' messages
+  bool dropped = false;     // a message that the real one drops: not configured, or no storebag
   Dictionary sessionInfo;
   std::optional<Dictionary> userInfo;
   Dictionary payload;
