@@ -115,5 +115,12 @@ TEST(CommandLineOfKytctl, RefusesAnEmptyValueWhereItMeansNothing) {
   }
 }
 
+TEST(CommandLineOfKytctl, TakesNoNegativeNumberWhereNoneIsMeant) {
+  const ProgramRun wrong =
+      runProgram(KYT_PROGRAMS "/kytctl", {"listen", "--socket", "/nonexistent/s", "--die-after", "-1"});
+  EXPECT_EQ(wrong.status, 2) << wrong.text;
+  EXPECT_TRUE(has(wrong.text, "-1 is negative")) << wrong.text;
+}
+
 }  // namespace
 }  // namespace kyt

@@ -72,6 +72,19 @@ TEST_F(KytctlEvents, CheckPrintsOneJSONObject) {
   EXPECT_TRUE(second->contains("text"));
 }
 
+TEST_F(KytctlEvents, WhatIsMadeOfAFileDoesNotTakeItsPlace) {
+  const std::string text = eventText("login", 10, 1, fieldText("email", "string", true));
+  const std::string file = folder_.write("events.toml", text);
+  for (const std::string& output : {file, file.substr(0, file.rfind('/')) + "/./events.toml"}) {
+    for (const ProgramRun& made :
+         {run({"generate", file, "--lang", "c", "-o", output}), run({"document", file, "-o", output})}) {
+      EXPECT_EQ(made.status, 1);
+      EXPECT_EQ(made.text, "kytctl: " + output + ": is the file that describes the events\n");
+    }
+  }
+  EXPECT_EQ(run({"check", file, bag_}).status, 0);
+}
+
 TEST_F(KytctlEvents, CheckExitsWithTwoWhereItCannotTell) {
   const std::string good = folder_.write("events.toml", eventText("login", 10, 1));
   const std::string wrong = folder_.write("wrong.toml", eventText("login", 10, 1, "catgory = 1\nkind = 2\n"));

@@ -119,6 +119,7 @@ TEST_F(KytctlOnAStage, RefusesKeysThatAStepDoesNotHave) {
       {R"("send","category":3,"typ":1)", R"(send: unknown key "typ"; there are category, type, payload)"},
       {R"("send","category":3)", R"(send: "type" is missing)"},
       {R"("send","category":"three","type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
+      {R"("send","category":3,"type":1,"flag":9)", R"(send: "flag" must be a whole number from 0 to 3)"},
       {R"("send","category":70000,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
       {R"("send","category":-1,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},
       {R"("send","category":1.5,"type":1)", R"(send: "category" must be a whole number from 0 to 65535)"},

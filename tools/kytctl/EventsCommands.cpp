@@ -1,5 +1,7 @@
 // What a program reports, as its events.toml says.
 #include <cstdio>
+#include <filesystem>
+#include <system_error>
 #include <utility>
 #include <variant>
 
@@ -58,7 +60,11 @@ void printJSON(const EventsFile& file, const std::string& bag, const EventsVerdi
   std::printf("%s\n", prettyJSON(report).c_str());
 }
 
-int write(const std::string& text, const std::string& output) {
+// What is made of a file must not take its place.
+int write(const std::string& text, const std::string& output, const std::string& source) {
+  std::error_code none;
+  if (output != "-" && std::filesystem::equivalent(output, source, none))
+    return failed(output + ": is the file that describes the events");
   if (output == "-") {
     const bool isWritten =
         std::fwrite(text.data(), 1, text.size(), stdout) == text.size() && std::fflush(stdout) == 0;
@@ -106,7 +112,7 @@ int generateEventsCommand(const GenerateOptions& options) {
   for (const DeclaredEvent& event : file.events)
     if (event.category == 0)
       return failed(tomlError(options.file, event.line, "category 0 is the daemon's own").text);
-  return write(generateEvents(file, languageNamed(options.language)), options.output);
+  return write(generateEvents(file, languageNamed(options.language)), options.output, options.file);
 }
 
 int documentEventsCommand(const GenerateOptions& options) {
@@ -115,7 +121,7 @@ int documentEventsCommand(const GenerateOptions& options) {
     tell(*problems);
     return 1;
   }
-  return write(documentEvents(std::get<EventsFile>(read)), options.output);
+  return write(documentEvents(std::get<EventsFile>(read)), options.output, options.file);
 }
 
 }  // namespace kyt::tools

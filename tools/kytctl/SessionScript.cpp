@@ -15,7 +15,7 @@ namespace {
 
 // Messages that a script lets wait, well below what a session's queue holds.
 constexpr uint64_t kQueued = 1024;
-constexpr int64_t kLast16 = 65535, kLast31 = 2147483647, kLast32 = 4294967295;
+constexpr int64_t kLastFlag = 3, kLast16 = 65535, kLast31 = 2147483647, kLast32 = 4294967295;
 
 KeyRule number(std::string_view name, int64_t most, bool required = false) {
   return {name, KeyKind::number, required, 0, most};
@@ -83,7 +83,7 @@ std::map<std::string, SessionScript::Step> SessionScript::allSteps() {
             {number("category", kLast16, true),
              number("type", kLast16, true),
              {"payload", KeyKind::object},
-             number("flag", kLast32),
+             number("flag", kLastFlag),
              number("repeat", kLast32),
              {"reply", KeyKind::boolean}}}},
           {"flush", {&Script::flush, {}}},

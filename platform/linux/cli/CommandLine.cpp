@@ -96,8 +96,14 @@ CommandOption CommandOption::repeatable() const {
 // CLI11 takes an empty text for the number 0.
 template <typename Target>
 CommandOption Command::option(const char* name, Target& target, const char* help) const {
-  const CommandOption option(*app_.add_option(name, target, help));
+  CLI::Option* made = app_.add_option(name, target, help);
+  const CommandOption option(*made);
   if constexpr (kIsNumber<Target>) static_cast<void>(option.notEmpty());
+  // Which would be taken for a number near 2^64.
+  if constexpr (std::is_unsigned_v<Target>)
+    made->check([](const std::string& text) {
+      return text.starts_with('-') ? text + " is negative" : std::string();
+    });
   return option;
 }
 template CommandOption Command::option(const char*, std::string&, const char*) const;
