@@ -1,3 +1,5 @@
+import pathlib
+
 import pytest
 from conftest import eventually
 
@@ -41,3 +43,16 @@ def test_a_listener_that_cannot_start_leaves_no_folder(tmp_path, monkeypatch):
         with Listener(kytctl=str(tmp_path / "none")):
             pass
     assert not list(tmp_path.iterdir())
+
+
+def test_the_guides_test_runs(kyt_listener):
+    guide = pathlib.Path(__file__).parents[3] / "docs" / "PROGRAMS.md"
+    block = guide.read_text(encoding="utf-8").split("```python example=pytest\n")[1].split("```")[0]
+
+    def run_the_program():
+        with kyt.Session(20) as session:
+            session.send(10, 1, step=1)
+
+    made = {"run_the_program": run_the_program}
+    exec(block, made)
+    made["test_reports_its_start"](kyt_listener)
