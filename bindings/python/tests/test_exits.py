@@ -132,11 +132,19 @@ def test_a_program_that_is_interrupted_as_it_ends_hears_nothing_any_more(kyt_lis
 def test_ctrl_c_ends_the_waiting_for_an_answer(program, tmp_path):
     said = program(
         """
-        import os, signal, threading, time
+        import os, signal, sys, threading, time
         import kytreporting as kyt
+        from kytreporting import _calls
         session = kyt.Session(20, call_deadline=0)
+        main = threading.get_ident()
+        def waits():
+            frame = sys._current_frames()[main]
+            while frame is not None and frame.f_code is not _calls.wait.__code__:
+                frame = frame.f_back
+            return frame is not None
         def interrupt():
-            time.sleep(0.01)
+            while not waits():
+                time.sleep(0.001)
             os.kill(os.getpid(), signal.SIGINT)
         for wait in (session.flush, session.configure, session.fetch_display_url):
             threading.Thread(target=interrupt).start()
