@@ -32,6 +32,9 @@ namespace {
 
 using Problems = std::vector<std::string>;
 
+// What the package puts among the grants; no mistake of anybody's.
+constexpr const char kGuideToGrants[] = "README";
+
 void checkSettings(const std::string& path, Problems& problems) {
   for (const TomlError& problem : problemsOfSettings(path)) problems.push_back(problem.text);
   const auto read = readSettings(path);
@@ -51,9 +54,16 @@ void checkEntitlements(const std::string& folder, bool isPrivateRoot, Problems& 
     const EntitlementsFile file = readEntitlementsFile(folder + "/" + name, trusted);
     for (const TomlError& problem : file.problems) problems.push_back(problem.text);
   }
-  for (const std::string& name : listing.others)
-    problems.push_back(folder + "/" + name +
-                       ": is not read: its name must end in .toml and not begin with a point");
+}
+
+// Files beside the grants. They are no mistake: an editor leaves some behind, and a package manager.
+Problems remarksOnEntitlements(const std::string& folder) {
+  Problems remarks;
+  for (const std::string& name : entitlementsFiles(folder).others)
+    if (name != kGuideToGrants)
+      remarks.push_back(folder + "/" + name +
+                        ": is not read: its name must end in .toml and not begin with a point");
+  return remarks;
 }
 
 // A flat file that may be missing; none when it is, or is wrong.
@@ -153,7 +163,9 @@ std::vector<std::string> configurationProblems(const DaemonOptions& options) {
 
 int checkConfiguration(const DaemonOptions& options) {
   const std::vector<std::string> problems = configurationProblems(options);
-  for (const std::string& problem : problems) std::printf("%s\n", escapedText(problem).c_str());
+  const Paths paths = Paths::of(absolutePath(options.root), executableFolder());
+  for (const auto& lines : {problems, remarksOnEntitlements(paths.entitlements())})
+    for (const std::string& line : lines) std::printf("%s\n", escapedText(line).c_str());
   if (problems.empty()) std::printf("the configuration is good\n");
   return problems.empty() ? 0 : 1;
 }

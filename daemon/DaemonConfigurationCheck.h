@@ -12,7 +12,8 @@ namespace kyt {
 // "FILE:LINE: what is wrong", for each mistake; empty: none.
 [[nodiscard]] std::vector<std::string> configurationProblems(const DaemonOptions& options);
 
-// Prints them, or that there is none; returns the process's exit status: 1, or 0.
+// Prints them, or that there is none, and which files among the grants are not read, which is no mistake; returns the
+// process's exit status: 1, or 0.
 [[nodiscard]] int checkConfiguration(const DaemonOptions& options);
 
 }  // namespace kyt

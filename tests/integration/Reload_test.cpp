@@ -257,6 +257,21 @@ TEST_F(CheckConfig, FindsNothingInAGoodConfiguration) {
       << "and starts nothing";
 }
 
+// A package's guide and what an editor left behind: a unit whose reload failed for them could never be reloaded.
+TEST_F(CheckConfig, TakesNoFileThatIsNotReadForAMistake) {
+  const std::string folder = stage_->folder() + "/etc/kytreportingd/entitlements.d/";
+  ASSERT_FALSE(tools::writeFile(folder + "README", "How to grant", 0644));
+  ProgramRun run = check();
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_EQ(run.text, "the configuration is good\n");
+  ASSERT_FALSE(tools::writeFile(folder + "own.toml~", "[[grant]]", 0644));
+  run = check();
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_EQ(run.text, folder +
+                          "own.toml~: is not read: its name must end in .toml and not begin with a point\n"
+                          "the configuration is good\n");
+}
+
 TEST_F(CheckConfig, NamesEachMistakeOfTheSettingsWithItsLineAndTheNearestKey) {
   put("/etc/kytreportingd/kytreportingd.toml",
       settings_ + "[limits]\nmax_conections = 1\nmax_batch_bytes = 0\n");
