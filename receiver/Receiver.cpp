@@ -170,8 +170,6 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   }
   // Last: posts come at once, and from then on nothing may fail that would leave one without an answer.
   http::ServerOptions portOptions = serverOptions(settings.listen, Limits::maxConnections, settings);
-  // A front's few connections carry all posts, and one thread is woken less often for them than two; handshakes take long.
-  portOptions.threads = identity ? 2 : 1;
   portOptions.maxBodiesBytes = Limits::maxBodiesBytes;
   portOptions.maxDrainBytes = Limits::maxDrainBytes;
   server = HttpServer::start(portOptions, identity ? &*identity : nullptr, handler, suspensions, error);
