@@ -157,6 +157,22 @@ void Delivery::logAnswered(uint64_t token, const LogAnswer& answer) {
   answered(std::move(pending), answer);
 }
 
+void Delivery::partitionRefused(uint32_t partition, const std::string& why) {
+  std::vector<Pending> lost;
+  {
+    MutexLock lock(mutex_);
+    std::erase_if(pending_, [&](auto& entry) {
+      const bool isOfIt = partitionOf(*entry.second.message) == partition;
+      if (isOfIt) lost.push_back(std::move(entry.second));
+      return isOfIt;
+    });
+  }
+  if (lost.empty()) return;
+  count(figures_.logRefusals, lost.size());
+  distrust(partition, why.c_str());
+  for (Pending& pending : lost) refused(std::move(pending));
+}
+
 void Delivery::logIsUp(bool isUp) {
   std::vector<Pending> lost;
   {

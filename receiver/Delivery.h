@@ -50,6 +50,7 @@ class Delivery final : public LogListener, public Replays {
   }  // partitions whose posts go to the spool
 
   void logAnswered(uint64_t token, const LogAnswer& answer) override EXCLUDES(mutex_);
+  void partitionRefused(uint32_t partition, const std::string& why) override EXCLUDES(mutex_);
   void deadLetterAnswered(bool isStored) override {
     count(isStored ? figures_.deadLetters : figures_.deadLettersLeftOut);
   }

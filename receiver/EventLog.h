@@ -37,6 +37,8 @@ class LogListener {
  public:
   virtual ~LogListener() = default;
   virtual void logAnswered(uint64_t token, const LogAnswer& answer) = 0;
+  // The log refuses messages of that partition now, and does not say which: each that is on its way is given up.
+  virtual void partitionRefused(uint32_t partition, const std::string& why) = 0;
   // Of a dead letter: whether the log has it. Once for each, but for those that the end of the process cuts off.
   virtual void deadLetterAnswered(bool isStored) = 0;
   // Whether messages may be published. After `false` no answer to what was published before can be expected.

@@ -9,6 +9,9 @@
 namespace kyt::receiver {
 namespace {
 
+// The library frees each message in a thread of its own, which it wakes if that is idle: once for so many.
+constexpr size_t kKeptMessages = 256;
+
 // What stands behind a key of the stream's short answers, up to the comma or brace that ends it; empty: nothing. Only for
 // texts for people.
 std::string_view memberOf(std::string_view json, std::string_view key) {
@@ -64,26 +67,45 @@ void NatsLog::takeStreamInfo(std::string_view json) {
       static_cast<long long>(settings_.maxAge.count()));
 }
 
-void NatsLog::onMessage(natsConnection* /*connection*/, natsSubscription* /*subscription*/, natsMsg* message,
-                        void* self) {
-  auto& log = *static_cast<NatsLog*>(self);
-  const Owned<natsMsg> owned(message);
+void NatsLog::takeAnswers() {
+  for (size_t i = 0; i < subscriptions_.size(); ++i) {
+    uint64_t waiting = 0;
+    while (natsSubscription_QueuedMsgs(subscriptions_[i].get(), &waiting) == NATS_OK && waiting != 0)
+      for (; waiting != 0; --waiting) takeNext(i);
+  }
+}
+
+void NatsLog::takeNext(size_t subscription) {
+  natsMsg* message = nullptr;
+  const natsStatus status = natsSubscription_NextMsg(&message, subscriptions_[subscription].get(), 0);
+  if (status == NATS_NO_RESPONDERS) return tellNobodyTakes(subscription);
+  if (status != NATS_OK) return;
+  read_.emplace_back(message);
+  take(subscription, message);
+  if (read_.size() == kKeptMessages) read_.clear();
+}
+
+void NatsLog::take(size_t subscription, natsMsg* message) {
   std::string_view name = natsMsg_GetSubject(message);
-  if (name.size() <= log.inbox_.size()) return;
-  name.remove_prefix(log.inbox_.size());
-  if (name == "names") return log.takeStreamNames(dataOf(message));
-  if (name == "dead")
-    return log.endDeadLetter(!natsMsg_IsNoResponders(message) &&
-                             dataOf(message).find("\"error\"") == std::string_view::npos);
-  if (name == "info") return log.takeStreamInfo(dataOf(message));
+  name.remove_prefix(std::min(name.rfind('.') + 1, name.size()));
+  if (subscription == groups())
+    return endDeadLetter(dataOf(message).find("\"error\"") == std::string_view::npos);
+  if (name == "names") return takeStreamNames(dataOf(message));
+  if (name == "info") return takeStreamInfo(dataOf(message));
   uint64_t token = 0;
   const auto [end, error] = std::from_chars(name.data(), name.data() + name.size(), token);
-  if (error == std::errc() && end == name.data() + name.size()) log.takeAcknowledgement(token, message);
+  if (error == std::errc() && end == name.data() + name.size()) takeAcknowledgement(token, message);
+}
+
+void NatsLog::tellNobodyTakes(size_t subscription) {
+  if (subscription == groups()) return endDeadLetter(false);
+  if (subscription > groups()) return;  // asked again soon
+  for (auto partition = static_cast<uint32_t>(subscription); partition < settings_.partitions;
+       partition += groups())
+    listener_->partitionRefused(partition, "no stream takes the message");
 }
 
 void NatsLog::takeAcknowledgement(uint64_t token, natsMsg* message) {
-  if (natsMsg_IsNoResponders(message))
-    return listener_->logAnswered(token, {LogVerdict::refused, "no stream takes the message"});
   const std::string_view json = dataOf(message);
   if (json.find("\"error\"") != std::string_view::npos) {
     const std::string_view code = memberOf(json, "\"err_code\":");

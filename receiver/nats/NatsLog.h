@@ -1,14 +1,16 @@
 // The log on NATS JetStream. A message is published on the subject kyt.events.PARTITION with its ID in "Nats-Msg-Id", by
-// which the stream knows repeats, and with a reply subject of its own below one inbox, where the stream's acknowledgement
-// arrives. Dead letters go to "kyt.dead".
+// which the stream knows repeats, and with a reply subject of its own below one inbox, INBOX.GROUP.TOKEN, where the stream's
+// acknowledgement arrives. Dead letters go to "kyt.dead". That no stream takes a subject the library says of a subscription,
+// not of a message: so each group of partitions has a subscription of its own.
 //
-// Threads: one of its own ("kyt-publish") writes, so that nobody waits for a server that does not read; the library's
-// deliver answers.
+// Threads: who publishes writes as much as the server takes at once; one of its own ("kyt-log") connects, writes the rest,
+// and reads the answers (NatsSocket.h).
 #pragma once
 
 #include <nats/nats.h>
 
 #include <atomic>
+#include <chrono>
 #include <deque>
 #include <memory>
 #include <optional>
@@ -16,12 +18,14 @@
 #include <string_view>
 #include <thread>
 #include <utility>
+#include <vector>
 
 #include "platform/base/ConditionVariable.h"
 #include "platform/base/Mutex.h"
 #include "platform/queues/Log.h"
 #include "receiver/EventLog.h"
 #include "receiver/Settings.h"
+#include "receiver/nats/NatsSocket.h"
 #include "receiver/nats/NatsStreams.h"
 
 namespace kyt::receiver {
@@ -43,7 +47,10 @@ class NatsLog final : public EventLog {
   [[nodiscard]] StreamsMade makeStreams(bool updates);
 
  private:
+  static constexpr char kDead[] = "dead", kAsk[] = "ask";
   static constexpr uint64_t kUnknown = ~uint64_t{0};
+  // A write that the server does not take ends the connection, and another server is tried.
+  static constexpr std::chrono::milliseconds kWriteTime{1500};
   struct Item {
     uint64_t token = 0;  // 0: a dead letter
     std::shared_ptr<const LogMessage> message;
@@ -59,26 +66,27 @@ class NatsLog final : public EventLog {
   template <typename T>
   using Owned = std::unique_ptr<T, Free>;
 
-  // Which of the library's callbacks of this object may still come.
-  struct Ends {
-    bool subscription = true, connection = true;
-  };
-
   [[nodiscard]] natsStatus makeOptions(Owned<natsOptions>& options);
-  static void onMessage(natsConnection* connection, natsSubscription* subscription, natsMsg* message,
-                        void* self);
   static void onUp(natsConnection* connection, void* self);
   static void onDown(natsConnection* connection, void* self);
   static void onClosed(natsConnection* connection, void* self);
-  static void onLastMessage(void* self);
   void run() EXCLUDES(mutex_);
+  [[nodiscard]] Duration timeToWait() EXCLUDES(mutex_);
+  [[nodiscard]] std::optional<Item> takeItem() EXCLUDES(mutex_);
+  void writeQueue() EXCLUDES(mutex_);
+  [[nodiscard]] uint32_t groups() const;
+  void takeAnswers();
+  void takeNext(size_t subscription);
+  void take(size_t subscription, natsMsg* message);
+  void tellNobodyTakes(size_t subscription);
   [[nodiscard]] bool connect();
+  [[nodiscard]] natsStatus subscribe(natsConnection* connection);
   void noteConnected(natsConnection* connection);
-  [[nodiscard]] std::deque<Item> takeItems() EXCLUDES(mutex_);
   [[nodiscard]] bool isStopping() EXCLUDES(mutex_);
+  void writeOrQueue(Item item) EXCLUDES(mutex_);
   void write(const Item& item);
   [[nodiscard]] natsStatus publish(const Item& item);
-  void ask(const std::string& subject, const char* reply, const std::string& request);
+  void ask(const std::string& subject, const char* what, const std::string& request);
   void takeStreamNames(std::string_view json);
   void takeStreamInfo(std::string_view json);
   void takeAcknowledgement(uint64_t token, natsMsg* message);
@@ -89,14 +97,16 @@ class NatsLog final : public EventLog {
   Log& lines_;
   LogListener* listener_ = nullptr;
   std::string inbox_;
+  NatsSocket socket_;
   Owned<natsConnection> connection_;
-  Owned<natsSubscription> subscription_;
+  std::vector<Owned<natsSubscription>> subscriptions_;  // of the groups, then kDead, then kAsk
+  std::vector<Owned<natsMsg>> read_;                    // and answered; the thread's alone
   std::atomic<uint64_t> maxBodyBytes_{kUnknown};
   std::atomic<uint64_t> deadInFlight_{0};  // dead letters without an answer
   std::atomic<bool> isConnected_{false}, hasStream_{false};
   std::string toldProblem_;  // of connecting, told last; the thread's alone
   std::atomic<bool> isMissingTold_{false}, isRetentionTold_{false}, mustAskRetention_{false},
-      isTooSmall_{false};
+      isTooSmall_{false}, mustAskStream_{true};
   std::thread thread_;
 
   Mutex upMutex_;  // held while the listener is told, so that it is told in order
@@ -105,8 +115,9 @@ class NatsLog final : public EventLog {
 
   Mutex mutex_;
   ConditionVariable changed_;
-  std::deque<Item> queue_ GUARDED_BY(mutex_);
-  Ends ended_ GUARDED_BY(mutex_);
+  std::deque<Item> queue_ GUARDED_BY(mutex_);  // while the server does not take what was written
+  uint64_t writers_ GUARDED_BY(mutex_) = 0;    // threads in write()
+  bool isClosed_ GUARDED_BY(mutex_) = true;    // the library's connection: it calls back no more
   bool isStopping_ GUARDED_BY(mutex_) = false;
 };
 

@@ -312,6 +312,7 @@ class DeliveryToPartitions : public DeliveryTest {
     for (const auto& [id, times] : log_.stored()) posts += partitionOf(id, 2) == partition ? 1 : 0;
     return posts;
   }
+  void refuse(uint32_t partition) { delivery_.partitionRefused(partition, "nobody takes it"); }
   void expectTheOthersAreStored() {
     for (int i = 0; i < 40 && spool_.posts() != 100; ++i) pass(std::chrono::seconds(1));
     EXPECT_EQ(storedOf(1), 100U);
@@ -330,6 +331,31 @@ class DeliveryToPartitions : public DeliveryTest {
     EXPECT_EQ(delivery_.failing(), 0U);
   }
 };
+
+TEST_F(DeliveryToPartitions, OneThatIsRefusedAsAWholeCostsTheOthersNothing) {
+  log_.setMood(Mood::isSilent);
+  const auto first = take(idOf(0, 1)), second = take(idOf(0, 2)), other = take(idOf(1, 1));
+  refuse(0);
+  turn();
+  EXPECT_EQ(*first, Fate::spooled);
+  EXPECT_EQ(*second, Fate::spooled);
+  EXPECT_FALSE(other->has_value()) << "it is still on its way";
+  EXPECT_EQ(delivery_.failing(), 1U);
+  EXPECT_EQ(figures_.logRefusals, 2U);
+  EXPECT_TRUE(sink_.contains("log: nobody takes it; posts of partition 0 go to the spool"));
+  const auto later = take(idOf(0, 3));
+  turn();
+  EXPECT_EQ(*later, Fate::spooled) << "at once";
+}
+
+TEST_F(DeliveryToPartitions, ARefusalOfOneWithNothingOnItsWaySaysNothing) {
+  log_.setMood(Mood::isSilent);
+  const auto other = take(idOf(1, 1));
+  refuse(0);
+  EXPECT_EQ(delivery_.failing(), 0U);
+  EXPECT_EQ(figures_.logRefusals, 0U);
+  EXPECT_EQ(delivery_.pending(), 1U);
+}
 
 TEST_F(DeliveryToPartitions, OneThatRefusesKeepsNoPostOfAnotherFromTheLog) {
   fillSpool();

@@ -142,6 +142,17 @@ bool StreamView::setMaxMessageBytes(int32_t bytes) {
   return isDone;
 }
 
+bool StreamView::setSubject(const char* subject) {
+  jsStreamInfo* info = nullptr;
+  if (js_GetStreamInfo(&info, context_, "kyt-events", nullptr, nullptr) != NATS_OK) return false;
+  jsStreamConfig config = *info->Config;
+  config.Subjects = &subject;
+  config.SubjectsLen = 1;
+  const bool isDone = js_UpdateStream(nullptr, context_, &config, nullptr, nullptr) == NATS_OK;
+  jsStreamInfo_Destroy(info);
+  return isDone;
+}
+
 bool StreamView::remove(const char* stream) {
   return js_DeleteStream(context_, stream, nullptr, nullptr) == NATS_OK;
 }

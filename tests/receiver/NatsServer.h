@@ -71,6 +71,8 @@ class StreamView {
   // The stream may have so many bytes from now on.
   [[nodiscard]] bool setMaxBytes(int64_t bytes);
   [[nodiscard]] bool setMaxMessageBytes(int32_t bytes);
+  // The stream takes that subject alone from now on.
+  [[nodiscard]] bool setSubject(const char* subject);
   [[nodiscard]] bool remove(const char* stream);
 
  private:

@@ -1,6 +1,9 @@
 // The program with a real server of the log.
 #include <gtest/gtest.h>
 
+#include <thread>
+#include <vector>
+
 #include "http/PostDigest.h"
 #include "tests/receiver/ReceiverTest.h"
 
@@ -165,6 +168,17 @@ TEST_F(DeadLettersOfTheReceiver, HaveWhatTheLogNeverTakes) {
   EXPECT_EQ(letter(1).body, body.substr(0, 65536));
   EXPECT_EQ(letter(1).headers.at("Kyt-Reason"), "too-large-for-log");
   EXPECT_EQ(letter(1).headers.at("Kyt-Bytes"), std::to_string(body.size()));
+}
+
+// What follows another closely is written by another thread.
+TEST_F(DeadLettersOfTheReceiver, OfEmptyPostsReachTheLogHoweverCloselyTheyFollowEachOther) {
+  start();
+  for (int round = 1; round <= 12; ++round) {
+    std::vector<std::thread> devices;
+    for (int i = 0; i < 8; ++i) devices.emplace_back([&] { EXPECT_EQ(receiver_->post("").status, 400); });
+    for (std::thread& device : devices) device.join();
+    ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_dead_letters_total") == round * 8; }));
+  }
 }
 
 TEST_F(DeadLettersOfTheReceiver, CountAsSuchOnceTheLogHasThem) {
