@@ -302,6 +302,7 @@ int runDaemon(const DaemonOptions& options) {
   const std::string logs = folderOfMessageLogs(paths, log);
 
   giveLargeBlocksBack();
+  shareHeaps();
   // The service class is inherited by every thread that starts later.
   if (!enterUtilityServiceClass()) log.debug("main: The system refused the utility service class");
   if (stopSignals.error() != 0) {

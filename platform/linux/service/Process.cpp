@@ -64,6 +64,11 @@ void giveLargeBlocksBack() {
   (void)::mallopt(M_MMAP_THRESHOLD, kLarge);
 }
 
+void shareHeaps() {
+  constexpr int kHeaps = 4;
+  (void)::mallopt(M_ARENA_MAX, kHeaps);
+}
+
 void giveFreeMemoryBack() {
   (void)::malloc_trim(0);
 }
