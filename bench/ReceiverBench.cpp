@@ -221,8 +221,8 @@ Ratios round(Stand& stand, uint64_t posts) {
   return ratios;
 }
 
-// The goals are 1.5 and 1.15; single rounds on a machine with other work vary by a fifth, and a check must not fail for that.
-constexpr double kMostOfTheFloor = 2.2;
+// The goals are 1.5 and 1.15; medians of a few rounds on a machine with other work vary by a quarter, and a check must not fail for that.
+constexpr double kMostOfTheFloor = 1.9;
 constexpr double kMostOfOne = 1.4;
 
 // Whether the median of the rounds is within the bound.
