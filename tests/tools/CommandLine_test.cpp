@@ -115,11 +115,32 @@ TEST(CommandLineOfKytctl, RefusesAnEmptyValueWhereItMeansNothing) {
   }
 }
 
-TEST(CommandLineOfKytctl, TakesNoNegativeNumberWhereNoneIsMeant) {
-  const ProgramRun wrong =
-      runProgram(KYT_PROGRAMS "/kytctl", {"listen", "--socket", "/nonexistent/s", "--die-after", "-1"});
-  EXPECT_EQ(wrong.status, 2) << wrong.text;
-  EXPECT_TRUE(has(wrong.text, "-1 is negative")) << wrong.text;
+TEST(CommandLineOfKytctl, TakesNoNumberThatIsNotMeant) {
+  const std::pair<std::vector<std::string>, const char*> commands[] = {
+      {{"listen", "--socket", "/nonexistent/s", "--die-after", "-1"}, "-1 is negative"},
+      {{"listen", "--socket", "/nonexistent/s", "--die-after", " -1"}, " -1 is negative"},
+      {{"listen", "--socket", "/nonexistent/s", "--die-after", "18446744073709551616"},
+       "18446744073709551616 is too large"},
+      {{"send", "--client-type", "7", "--category", "1", "--type", "1", "--session-id=-18446744073709551615"},
+       "-18446744073709551615 is negative"},
+      {{"watch", "--category=-18446744073709551615"}, "-18446744073709551615 is negative"},
+      {{"explain", "{}", "--draw", "nan"}, "nan is no number"},
+      {{"send", "--client-type", "7", "--category", "1", "--type", "1", "--timeout", "nan"},
+       "nan is no number"}};
+  const TemporaryFolder root;
+  for (const auto& [command, text] : commands) {
+    std::vector<std::string> arguments{"--root", root.path()};
+    arguments.insert(arguments.end(), command.begin(), command.end());
+    const ProgramRun wrong = runProgram(KYT_PROGRAMS "/kytctl", arguments);
+    EXPECT_EQ(wrong.status, 2) << wrong.text;
+    EXPECT_TRUE(has(wrong.text, std::string(": ") + text + "\nTry 'kytctl " + command[0] + " --help'.\n"))
+        << wrong.text;
+  }
+  EXPECT_TRUE(has(runProgram(KYT_PROGRAMS "/kytctl",
+                             {"listen", "--socket", "/nonexistent/s", "--die-after", "18446744073709551615"})
+                      .text,
+                  "/nonexistent/s"))
+      << "the largest one is taken";
 }
 
 }  // namespace

@@ -1,9 +1,12 @@
 #include "platform/linux/cli/CommandLine.h"
 
 #include <CLI/CLI.hpp>
+#include <cerrno>
 #include <chrono>
+#include <cmath>
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <string>
 #include <type_traits>
@@ -43,10 +46,34 @@ void complain(const CLI::App& app, const std::string& what) {
   std::fprintf(stderr, "%s: %s\n", app.get_name().c_str(), escapedText(what).c_str());
 }
 
+// What an option's text becomes.
 template <typename Target>
-constexpr bool kIsNumber = std::is_arithmetic_v<Target>;
+struct ValueOf {
+  using Type = Target;
+};
 template <typename Target>
-constexpr bool kIsNumber<std::optional<Target>> = kIsNumber<Target>;
+struct ValueOf<std::optional<Target>> {
+  using Type = Target;
+};
+
+// Says of a text that CLI11 would make another number of it; empty where it would not.
+template <typename Number>
+std::string mistakenNumber(const std::string& text) {
+  if constexpr (std::is_unsigned_v<Number>)
+    if (text.find('-') != std::string::npos) return text + " is negative";  // it adds 2^64
+  if constexpr (std::is_floating_point_v<Number>) {
+    // No comparison finds it outside a range.
+    if (std::isnan(std::strtod(text.c_str(), nullptr))) return text + " is no number";
+  } else {
+    errno = 0;
+    if constexpr (std::is_unsigned_v<Number>)
+      static_cast<void>(std::strtoull(text.c_str(), nullptr, 0));
+    else
+      static_cast<void>(std::strtoll(text.c_str(), nullptr, 0));
+    if (errno == ERANGE) return text + " is too large";  // it takes the largest one
+  }
+  return {};
+}
 
 }  // namespace
 
@@ -98,12 +125,11 @@ template <typename Target>
 CommandOption Command::option(const char* name, Target& target, const char* help) const {
   CLI::Option* made = app_.add_option(name, target, help);
   const CommandOption option(*made);
-  if constexpr (kIsNumber<Target>) static_cast<void>(option.notEmpty());
-  // Which would be taken for a number near 2^64.
-  if constexpr (std::is_unsigned_v<Target>)
-    made->check([](const std::string& text) {
-      return text.starts_with('-') ? text + " is negative" : std::string();
-    });
+  using Value = typename ValueOf<Target>::Type;
+  if constexpr (std::is_arithmetic_v<Value>) {
+    static_cast<void>(option.notEmpty());
+    made->check([](const std::string& text) { return mistakenNumber<Value>(text); });
+  }
   return option;
 }
 template CommandOption Command::option(const char*, std::string&, const char*) const;
