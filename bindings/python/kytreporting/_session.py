@@ -583,8 +583,10 @@ class Session:
         value: Optional[BaseException],
         traceback: Optional[TracebackType],
     ) -> None:
-        self.finish()
-        self.close()
+        try:
+            self.finish()
+        finally:  # by Ctrl-C too
+            self.close()
 
     async def __aenter__(self) -> "Session":
         return self
@@ -595,8 +597,10 @@ class Session:
         value: Optional[BaseException],
         traceback: Optional[TracebackType],
     ) -> None:
-        await self.afinish()
-        self.close()
+        try:
+            await self.afinish()
+        finally:  # of a task that is cancelled too
+            self.close()
 
 
 def _message(category: int, type: int, payload: Optional[Payload], fields: Mapping[str, Any]) -> Dictionary:

@@ -1,3 +1,10 @@
+import asyncio
+
+import pytest
+
+import kytreporting as kyt
+
+
 def test_what_is_queued_when_the_program_ends_is_sent(kyt_listener, program):
     program(
         """
@@ -157,3 +164,55 @@ def test_ctrl_c_ends_the_waiting_for_an_answer(program, tmp_path):
         KYTREPORTING_SOCKET=str(tmp_path / "none"),
     )
     assert said == "interrupted\n" * 3
+
+
+def test_ctrl_c_while_a_with_statement_ends_leaves_no_session(program, tmp_path):
+    said = program(
+        """
+        import os, signal, sys, threading, time
+        import kytreporting as kyt
+        class Session(kyt.Session):
+            def finish(self, timeout=0.5):
+                return super().finish(timeout)
+        main = threading.get_ident()
+        def finishes():
+            frame = sys._current_frames()[main]
+            while frame is not None and frame.f_code is not kyt.Session.finish.__code__:
+                frame = frame.f_back
+            return frame is not None
+        def interrupt():
+            while not finishes():
+                time.sleep(0.001)
+            os.kill(os.getpid(), signal.SIGINT)
+        try:
+            with Session(20, finish_waits_for_daemon=True) as session:
+                session.send(1, 1)
+                threading.Thread(target=interrupt).start()
+        except KeyboardInterrupt:
+            print("interrupted", session.statistics().queued, session.statistics().lost_in_queue)
+        """,
+        KYTREPORTING_SOCKET=str(tmp_path / "none"),
+    )
+    assert said == "interrupted 0 1\n"
+
+
+def test_a_task_that_is_cancelled_as_it_ends_leaves_no_session(tmp_path, monkeypatch):
+    monkeypatch.setenv("KYTREPORTING_SOCKET", str(tmp_path / "none"))
+    sessions = []
+
+    async def report():
+        async with kyt.Session(20, finish_waits_for_daemon=True) as session:
+            session.send(1, 1)
+            sessions.append(session)
+
+    async def end():
+        task = asyncio.create_task(report())
+        while not sessions or not sessions[0]._ended:
+            await asyncio.sleep(0.001)
+        task.cancel()
+        with pytest.raises(asyncio.CancelledError):
+            await task
+        return sessions[0].statistics()
+
+    figures = asyncio.run(end())
+    assert (figures.queued, figures.lost_in_queue) == (0, 1)
