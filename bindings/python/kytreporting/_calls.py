@@ -41,18 +41,27 @@ def begin() -> "tuple[int, concurrent.futures.Future[Any]]":
     return number, future
 
 
-def wait(future: "concurrent.futures.Future[T]", timeout: Optional[float]) -> T:
-    """The answer, or its error. None waits as long as the library does."""
+def wait(ask: "Callable[[], concurrent.futures.Future[T]]", timeout: Optional[float]) -> T:
+    """Asks, and waits for the answer, or its error. None waits as long as the library does."""
+    seconds = None if timeout is None else _seconds_of(timeout)  # before anything is asked
+    future = ask()
     if getattr(within, "callback", False) and not future.done():
         raise RuntimeError("a callback runs on the thread that would bring the answer: it may not wait for one")
-    if timeout is not None and not isinstance(timeout, (int, float)):
-        raise InvalidError(f"timeout must be a number of seconds, not a value of the type {type(timeout).__name__}")
     try:
-        return future.result(timeout)
+        return future.result(seconds)
     except concurrent.futures.TimeoutError as late:
         if isinstance(late, TimedOutError):
             raise
-        raise TimedOutError(f"no answer within {timeout:g} s") from None
+        raise TimedOutError(f"no answer within {seconds:g} s") from None
+
+
+def _seconds_of(timeout: float) -> float:
+    """What a thread can wait for, which is some 290 years."""
+    if not isinstance(timeout, (int, float)):
+        raise InvalidError(f"timeout must be a number of seconds, not a value of the type {type(timeout).__name__}")
+    if timeout != timeout:
+        raise InvalidError("timeout must be a number of seconds, not nan")
+    return float(max(0.0, min(timeout, threading.TIMEOUT_MAX)))
 
 
 def forget_all() -> None:

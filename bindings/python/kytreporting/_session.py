@@ -26,7 +26,7 @@ from ._errors import ClosedError, Error, InvalidError, error_of
 from ._library import AGGREGATION_CALLBACK, STATE_CALLBACK, Figures, Options, lib
 from ._statistics import Statistics, statistics_of
 from ._timing import Counter, Timer
-from ._values import Array, Dictionary, Payload, checked_mapping, checked_number, text_bytes
+from ._values import Array, Dictionary, Payload, checked_mapping, checked_number, shown, text_bytes
 
 _REASON_BYTES = 512
 _MOST_SECONDS = 4_294_967  # 49 days: 32 bits of milliseconds
@@ -135,7 +135,7 @@ def _milliseconds(what: str, seconds: float) -> int:
     if not isinstance(seconds, (int, float)):
         raise InvalidError(f"{what} must be a number of seconds, not a value of the type {type(seconds).__name__}")
     if not 0 <= seconds <= _MOST_SECONDS:
-        raise InvalidError(f"{what}: {seconds} is no number of seconds from 0 to {_MOST_SECONDS}")
+        raise InvalidError(f"{what}: {shown(seconds)} is no number of seconds from 0 to {_MOST_SECONDS}")
     return math.ceil(seconds * 1000)
 
 
@@ -357,7 +357,7 @@ class Session:
         **fields: Any,
     ) -> Optional[str]:
         """The same, and waits for the daemon's answer: the text of what was posted, or None."""
-        return _calls.wait(self._reply(category, type, payload, fields, flag), timeout)
+        return _calls.wait(lambda: self._reply(category, type, payload, fields, flag), timeout)
 
     async def asend_with_reply(
         self, category: int, type: int, payload: Optional[Payload] = None, /, *, flag: int = Flag.NONE, **fields: Any
@@ -391,7 +391,7 @@ class Session:
 
     def configure(self, timeout: Optional[float] = None) -> Optional[List[str]]:
         """Asks the daemon to configure the session. The names of the live back ends; None without a storebag."""
-        return _calls.wait(self._configuration(), timeout)
+        return _calls.wait(self._configuration, timeout)
 
     async def aconfigure(self) -> Optional[List[str]]:
         """configure() for asyncio."""
@@ -407,7 +407,7 @@ class Session:
         self, user_info: Optional[Payload] = None, *, timeout: Optional[float] = None
     ) -> Optional[List[str]]:
         """The live back ends. With user information that takes the place of what there was: then as of that."""
-        return _calls.wait(self._states(user_info), timeout)
+        return _calls.wait(lambda: self._states(user_info), timeout)
 
     async def afetch_states(self, user_info: Optional[Payload] = None) -> Optional[List[str]]:
         """fetch_states() for asyncio."""
@@ -425,7 +425,7 @@ class Session:
 
     def fetch_display_url(self, timeout: Optional[float] = None) -> Optional[str]:
         """The address for people that the storebag names."""
-        return _calls.wait(self._display_url(), timeout)
+        return _calls.wait(self._display_url, timeout)
 
     async def afetch_display_url(self) -> Optional[str]:
         """fetch_display_url() for asyncio."""
@@ -441,7 +441,7 @@ class Session:
 
         Raises BackEndError with the first back end's text, such as "Nothing to flush".
         """
-        return _calls.wait(self._flush(), timeout)
+        return _calls.wait(self._flush, timeout)
 
     async def aflush(self) -> Optional[str]:
         """flush() for asyncio."""
@@ -456,7 +456,7 @@ class Session:
 
     def upload_file(self, path: Union[str, "os.PathLike[str]"], timeout: Optional[float] = None) -> bool:
         """Whether a back end took the file. It is opened at once, with this program's rights."""
-        return _calls.wait(self._upload(path), timeout)
+        return _calls.wait(lambda: self._upload(path), timeout)
 
     async def aupload_file(self, path: Union[str, "os.PathLike[str]"]) -> bool:
         """upload_file() for asyncio."""
@@ -470,7 +470,7 @@ class Session:
 
     def upload_log_data(self, log_data: Sequence[Any], timeout: Optional[float] = None) -> bool:
         """Whether a back end took the data."""
-        return _calls.wait(self._upload_data(log_data), timeout)
+        return _calls.wait(lambda: self._upload_data(log_data), timeout)
 
     async def aupload_log_data(self, log_data: Sequence[Any]) -> bool:
         """upload_log_data() for asyncio."""
@@ -608,7 +608,7 @@ def _message(category: int, type: int, payload: Optional[Payload], fields: Mappi
         if not isinstance(number, int):
             raise InvalidError("category and type are whole numbers")
         if not 0 <= number < 2**32:  # the library refuses the rest, and counts it
-            raise InvalidError(f"category {category}, type {type}: both are whole numbers from 0 to 65535")
+            raise InvalidError(f"category {shown(category)}, type {shown(type)}: both are whole numbers from 0 to 65535")
     if payload is None:
         return Dictionary(fields)
     checked_mapping("payload", payload)
@@ -643,7 +643,7 @@ def send_single(
     "finished": the daemon had a storebag and has offered the event to its back ends; or "storebag not available".
     """
     names = (client_type, client, service, user_info, session_id, require_user_info, socket)
-    return _calls.wait(_single(category, type, payload, fields, *names), timeout) or ""
+    return _calls.wait(lambda: _single(category, type, payload, fields, *names), timeout) or ""
 
 
 async def asend_single(

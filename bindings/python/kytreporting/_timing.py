@@ -11,7 +11,7 @@ from types import TracebackType
 from typing import TYPE_CHECKING, Any, Callable, Dict, Optional, Tuple, Type, TypeVar, cast
 
 from ._errors import InvalidError
-from ._values import Dictionary, checked_number
+from ._values import Dictionary, checked_number, shown
 
 if TYPE_CHECKING:
     from ._session import Session
@@ -32,7 +32,7 @@ class _Measure:
             if not isinstance(number, int):
                 raise InvalidError("category and type are whole numbers")
         if not (0 <= category <= 0xFFFF and 0 <= type <= 0xFFFF):
-            raise InvalidError(f"category {category} and type {type}: both are 0 to 65535")
+            raise InvalidError(f"category {shown(category)} and type {shown(type)}: both are 0 to 65535")
         with Dictionary(fields):
             self._session = session
         self._category = category

@@ -35,7 +35,7 @@ def checked_number(what: str, value: Any, low: float, high: float, whole: bool =
         kind = "whole number" if whole else "number"
         raise InvalidError(f"{what} must be a {kind}, not a value of the type {type(value).__name__}")
     if not low <= value <= high:
-        raise InvalidError(f"{what} must be from {low} to {high}, not {_shown(value) if isinstance(value, int) else value}")
+        raise InvalidError(f"{what} must be from {low} to {high}, not {shown(value)}")
 
 
 def _seconds(value: datetime.datetime) -> float:
@@ -45,9 +45,11 @@ def _seconds(value: datetime.datetime) -> float:
         raise InvalidError(f"the date {value} cannot be sent: {error}") from None
 
 
-def _shown(value: int) -> str:
+def shown(value: float) -> str:
     """Python refuses to write a number of thousands of digits."""
-    return str(value) if value.bit_length() < 1000 else f"a number of {value.bit_length()} bits"
+    if isinstance(value, int) and value.bit_length() >= 1000:
+        return f"a number of {value.bit_length()} bits"
+    return str(value)
 
 
 def _unknown(value: object) -> InvalidError:
@@ -116,7 +118,7 @@ def _put(library: Any, prefix: str, where: Sequence[Any], value: Any, depth: int
         put("bool", value)
     elif isinstance(value, int):
         if not -(2**63) <= value < 2**64:
-            raise InvalidError(f"{_shown(value)}: whole numbers have 64 bits")
+            raise InvalidError(f"{shown(value)}: whole numbers have 64 bits")
         put("int" if value < 2**63 else "uint", value)
     elif isinstance(value, float):
         put("double", value)

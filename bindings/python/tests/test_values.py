@@ -164,9 +164,13 @@ def test_a_deadline_below_a_millisecond_is_a_deadline(tmp_path):
         (lambda session: session.set_digest_key("x"), "key must be bytes"),
         (lambda session: session.set_digest_key(b"x", 2**40), "algorithm must be from"),
         (lambda session: session.fetch_states([1]), "user_info must be a mapping"),
+        (lambda session: session.send(10**5000, 1), "category a number of 16610 bits, type 1: both are whole"),
+        (lambda session: session.send_with_reply(1, 1, timeout="1"), "timeout must be a number of seconds"),
+        (lambda session: session.send_with_reply(1, 1, timeout=float("nan")), "timeout must be a number of seconds"),
         (lambda session: session.flush(timeout="1"), "timeout must be a number of seconds"),
         (lambda session: session.finish(None), "timeout must be a number of seconds"),
         (lambda session: session.timed("x", 1), "category and type are whole numbers"),
+        (lambda session: session.timed(10**5000, 1), "category a number of 16610 bits and type 1: both are 0 to"),
         (lambda session: session.counter(1, 1, interval="x"), "interval must be a number"),
     ],
 )
@@ -192,8 +196,15 @@ def test_an_argument_of_a_wrong_type_is_named(kyt_listener, call, text):
         ({"max_queued_messages": 64.5}, "max_queued_messages must be a whole number"),
         ({"call_deadline": "x"}, "call_deadline must be a number of seconds"),
         ({"flush_interval": None}, "flush_interval must be a number of seconds"),
+        ({"call_deadline": 10**5000}, "call_deadline: a number of 16610 bits is no number of seconds from"),
     ],
 )
 def test_a_session_names_its_argument_of_a_wrong_type(arguments, text):
     with pytest.raises(kyt.InvalidError, match=text):
         kyt.Session(**{"client_type": 20, **arguments})
+
+
+@pytest.mark.parametrize("timeout", [1e300, float("inf"), 10**400])
+def test_a_timeout_may_be_longer_than_a_thread_can_wait(kyt_listener, timeout):
+    with kyt.Session(20) as session:
+        assert session.send_with_reply(1, 1, timeout=timeout) is None
