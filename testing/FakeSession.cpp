@@ -24,10 +24,20 @@ bool FakeSession::hasStorebag(const Dictionary& info) const {
   return states_ && storebagNameForClientType(info.integer(kKYTReportingSessionInfoClientType)).has_value();
 }
 
-bool FakeSession::takesUploads() const {
-  return isConfigured_ && std::ranges::any_of(*states_, [](const Value& name) {
-           return name.string() != nullptr && *name.string() == kKYTReportingBackendUploadServer;
+bool FakeSession::has(std::initializer_list<const char*> backEnds) const {
+  return isConfigured_ && std::ranges::any_of(*states_, [backEnds](const Value& name) {
+           return name.string() != nullptr && std::ranges::any_of(backEnds, [&name](const char* backEnd) {
+                    return *name.string() == backEnd;
+                  });
          });
+}
+
+bool FakeSession::takesUploads() const {
+  return has({kKYTReportingBackendUploadServer});
+}
+
+bool FakeSession::keepsBatches() const {
+  return has({kKYTReportingBackendHTTPPost, kKYTReportingBackendHTTPPost2, kKYTReportingBackendQRS});
 }
 
 void FakeSession::setSessionInfo(Dictionary info, std::optional<Dictionary> user, Value /*frameworks*/,
@@ -46,7 +56,7 @@ void FakeSession::startConfigWithCompletionHandler(StatesReply reply) {
   if (!note(event(Kind::configuration))) return keep(std::move(reply));
   isConfigured_ = isConfigured_ || hasStorebag_;
   // The session's start message is an event like others.
-  pending_ = isConfigured_ && !states_->empty() && batches_;
+  pending_ = batches_ && keepsBatches();
   reply(hasStorebag_ ? states_ : std::nullopt);
 }
 
@@ -71,7 +81,7 @@ void FakeSession::sendMessageWithDictionary(Dictionary message, ObjectReply repl
     made.payload = *payload;
   made.dropped = !isConfigured_;
   const bool isRealtime = (made.flag & kRealtime) != 0;  // what was batched goes before it
-  pending_ = !isRealtime && (pending_ || (isConfigured_ && !states_->empty() && batches_));
+  pending_ = !isRealtime && (pending_ || (batches_ && keepsBatches()));
   const bool noted = note(made);
   if (noted && !made.dropped) aggregators_->offer(made);
   if (!reply) return;
@@ -83,7 +93,9 @@ void FakeSession::flushMessagesWithCompletion(ResultReply completion) {
   if (!note(event(Kind::flush))) return keep(std::move(completion));
   if (!isConfigured_)
     return completion(Value(), Error{kKYTReportingErrorDomain, -1, "No backends available to send message"});
-  if (std::exchange(pending_, false)) return completion(Value(), std::nullopt);
+  // Back ends that never batch have nothing against it.
+  const bool noneBatches = !states_->empty() && !keepsBatches();
+  if (std::exchange(pending_, false) || noneBatches) return completion(Value(), std::nullopt);
   completion(Value(), Error{kKYTReportingErrorDomain, -1, "Nothing to flush"});
 }
 

@@ -2,6 +2,7 @@
 // Called on the connection's queue.
 #pragma once
 
+#include <initializer_list>
 #include <memory>
 #include <optional>
 #include <utility>
@@ -44,7 +45,10 @@ class FakeSession final : public ClientSessionInterface {
  private:
   [[nodiscard]] Event event(Kind kind) const;
   [[nodiscard]] bool hasStorebag(const Dictionary& info) const;
+  // One of these is live.
+  [[nodiscard]] bool has(std::initializer_list<const char*> backEnds) const;
   [[nodiscard]] bool takesUploads() const;  // one of the back ends is for files and log data
+  [[nodiscard]] bool keepsBatches() const;  // one of them can be flushed
   // False: the daemon is dead.
   bool note(Event event) const { return records_->add(std::move(event)); }
   // Of a dead daemon: an answer that is dropped would be an error, so it is kept until the connection is gone.

@@ -116,6 +116,11 @@ class FakeDaemonLikeness : public StageTest {
     startDaemon();
     ASSERT_EQ(fake_.start(), std::nullopt);
   }
+  void putBackEnd(const std::string& storebag, const char* name) {
+    const Dictionary backEnds{{name, Dictionary{{"post_url", stage_->httpsBase() + "/upload"}}}};
+    ASSERT_EQ(stage_->putStorebag(storebag, Dictionary{{"version", "1"}, {"release", backEnds}}),
+              std::nullopt);
+  }
   // What the steps show with the fake, once it was compared with the real one.
   template <typename Steps>
   std::string compared(const SessionInfo& info, Steps steps) {
@@ -193,6 +198,27 @@ TEST_F(FakeDaemonLikeness, UploadsThatNoBackEndTakes) {
     program.uploadLogData();
     program.finish();
   });
+}
+
+TEST_F(FakeDaemonLikeness, AFlushOfBackEndsThatNeverBatch) {
+  putBackEnd("dulvek", "uploadserver");
+  testing::FakeDaemon::Options options;
+  options.live = {"uploadserver"};
+  testing::FakeDaemon fake(std::move(options));
+  ASSERT_EQ(fake.start(), std::nullopt);
+  for (const bool batch : {false, true}) {
+    const SessionInfo info{.sessionID = 5, .clientType = 8, .batchEvent = batch};
+    Program real(socket(), info), likeIt(fake.socketPath(), info);
+    for (Program* program : {&real, &likeIt}) {
+      program->configure();
+      program->send();
+      program->flush();
+      program->flush();
+      program->finish();
+    }
+    EXPECT_EQ(real.said(), likeIt.said());
+    EXPECT_NE(real.said().find("live: uploadserver"), std::string::npos) << real.said() << daemonLog();
+  }
 }
 
 TEST_F(FakeDaemonLikeness, SingleMessages) {
