@@ -217,6 +217,15 @@ class Session:
                 raise InvalidError(f"{what} must be a function, not a value of the type {type(function).__name__}")
         if hierarchy is not None and not (isinstance(hierarchy, (tuple, list)) and len(hierarchy) == 2):
             raise InvalidError("hierarchy must be a token and a level")
+        if hierarchy is not None and None in hierarchy:  # which would be left out: the level is 0 then
+            raise InvalidError("hierarchy must be a token and a level, neither of them None")
+        for what, flag in (
+            ("finish_waits_for_daemon", finish_waits_for_daemon),
+            ("wait_for_daemon", wait_for_daemon),
+            ("configure", configure),
+        ):
+            if not isinstance(flag, int):
+                raise InvalidError(f"{what} must be a boolean, not a value of the type {type(flag).__name__}")
         self._information: Dict[str, Any] = {
             "SessionID": secrets.randbits(32) if session_id is None else session_id,
             "ClientType": client_type,
@@ -235,7 +244,7 @@ class Session:
         self._told = on_state_change
         self._aggregates = on_aggregated
         self._deadline = _milliseconds("call_deadline", call_deadline)
-        self._waits = finish_waits_for_daemon
+        self._waits = bool(finish_waits_for_daemon)
         self._flush_interval = _milliseconds("flush_interval", flush_interval)
         self._needs_daemon = not wait_for_daemon
         self._configured = configure
@@ -416,10 +425,11 @@ class Session:
     def _states(self, user_info: Optional[Payload]) -> "concurrent.futures.Future[Optional[List[str]]]":
         if user_info is not None:
             checked_mapping("user_info", user_info)
-            self._user = dict(user_info)
-        with Dictionary(self._user) as user:
+        entries = self._user if user_info is None else dict(user_info)
+        with Dictionary(entries) as user:
             number, future = self._begin()
-            pointer = None if self._user is None else user.pointer
+            self._user = entries  # now that it can be meant so
+            pointer = None if entries is None else user.pointer
             lib.kyt_session_fetch_states(self._handle(), pointer, _calls.on_states, number)
         return future
 

@@ -191,6 +191,11 @@ def test_an_argument_of_a_wrong_type_is_named(kyt_listener, call, text):
         ({"service": b"x"}, "service must be a text, not a value of the type bytes"),
         ({"user_info": [1]}, "user_info must be a mapping"),
         ({"hierarchy": "x"}, "hierarchy must be a token and a level"),
+        ({"hierarchy": ("token", None)}, "hierarchy must be a token and a level, neither of them None"),
+        ({"hierarchy": (None, 0)}, "hierarchy must be a token and a level, neither of them None"),
+        ({"finish_waits_for_daemon": "no"}, "finish_waits_for_daemon must be a boolean, not a value of the type str"),
+        ({"wait_for_daemon": None}, "wait_for_daemon must be a boolean"),
+        ({"configure": None}, "configure must be a boolean"),
         ({"on_state_change": 5}, "on_state_change must be a function"),
         ({"on_aggregated": "x"}, "on_aggregated must be a function"),
         ({"max_queued_messages": 64.5}, "max_queued_messages must be a whole number"),
@@ -208,3 +213,12 @@ def test_a_session_names_its_argument_of_a_wrong_type(arguments, text):
 def test_a_timeout_may_be_longer_than_a_thread_can_wait(kyt_listener, timeout):
     with kyt.Session(20) as session:
         assert session.send_with_reply(1, 1, timeout=timeout) is None
+
+
+def test_user_information_that_cannot_be_sent_changes_nothing(kyt_listener):
+    with kyt.Session(20, "x") as session:
+        for wrong in ({1: 2}, {"a": object()}):
+            with pytest.raises(kyt.InvalidError):
+                session.fetch_states(wrong)
+        assert session.fetch_states() == ["httppost"]
+    assert [told["userInfo"] for told in kyt_listener.events("states")] == [{"ClientName": "x"}]
