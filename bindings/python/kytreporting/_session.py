@@ -719,9 +719,12 @@ def _at_exit() -> None:
                 except Error as error:
                     print(f"kytreporting: {error}", file=sys.stderr)
     finally:  # whatever the program was told meanwhile, by Ctrl-C too
-        with _program.opening:
-            _program.ended = True
-        lib.kyt_close_all()
+        _program.ended = True
+        try:
+            with _program.opening:  # who has begun to open something is done
+                pass
+        finally:  # by a second Ctrl-C too
+            lib.kyt_close_all()
 
 
 def _is_of_a_forkserver() -> bool:

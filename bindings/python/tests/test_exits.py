@@ -136,6 +136,40 @@ def test_a_program_that_is_interrupted_as_it_ends_hears_nothing_any_more(kyt_lis
     assert said == "interrupted\nthe program ends\n"
 
 
+def test_a_program_that_is_interrupted_twice_as_it_ends_leaves_no_session(program, tmp_path):
+    said = program(
+        """
+        import atexit, os, signal, threading
+        import kytreporting as kyt
+        from kytreporting import _session
+        session = kyt.Session(20)
+        session.send(1, 1)
+        def interrupted(*arguments):
+            raise KeyboardInterrupt
+        session.finish = interrupted
+        atexit.unregister(_session._at_exit)
+        class Opening:  # another thread opens something
+            def __enter__(self):
+                os.kill(os.getpid(), signal.SIGINT)
+                threading.Event().wait(60)
+            def __exit__(self, *error):
+                pass
+        _session._program.opening, opening = Opening(), _session._program.opening
+        try:
+            _session._at_exit()
+        except KeyboardInterrupt:
+            print("interrupted", session.statistics().queued, session.statistics().lost_in_queue)
+        _session._program.opening = opening
+        try:
+            kyt.send_single(1, 2, client_type=20)
+        except kyt.ClosedError as error:
+            print(error)
+        """,
+        KYTREPORTING_SOCKET=str(tmp_path / "none"),
+    )
+    assert said == "interrupted 0 1\nthe program ends\n"
+
+
 def test_ctrl_c_ends_the_waiting_for_an_answer(program, tmp_path):
     said = program(
         """
