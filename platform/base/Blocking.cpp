@@ -20,7 +20,14 @@ HeldBack* HeldBack::exchange(HeldBack* held) noexcept {
 
 BlockingScope::BlockingScope(BlockingKind kind) : observer_(blockingObserver) {
   if (heldBack != nullptr) heldBack->giveAway();
-  if (observer_ != nullptr && observer_->depth_++ == 0) observer_->willBlock(kind);
+  if (observer_ == nullptr) return;
+  const bool isNested = observer_->depth_ != 0;
+  BlockingObserver& observer = *observer_;
+  if (kind == BlockingKind::computing)
+    observer_ = nullptr;  // what waits within it is told
+  else
+    ++observer.depth_;
+  if (!isNested) observer.willBlock(kind);
 }
 
 BlockingScope::~BlockingScope() {

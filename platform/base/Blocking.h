@@ -12,12 +12,12 @@ namespace kyt {
 // counts on the thread for what is urgent is told, and its processor is not given to another.
 enum class BlockingKind : uint8_t { inLine, other, computing };
 
-// Who is told when its thread is about to wait. Nested waits are told once.
+// Who is told when its thread is about to wait. Nested waits are told once; those while it computes as any others.
 class BlockingObserver {
  public:
   virtual ~BlockingObserver() = default;
   virtual void willBlock(BlockingKind kind) = 0;
-  virtual void hasBlocked() = 0;
+  virtual void hasBlocked() = 0;  // not after `computing`
   // Of the calling thread; null: none. Returns the former one.
   static BlockingObserver* exchange(BlockingObserver* observer) noexcept;
 

@@ -42,7 +42,6 @@ struct WorkerPool::Worker final : BlockingObserver {
   bool inLine = false;  // for a lock that others' queues hold
   // Its own thread's.
   const SerialQueue* queue = nullptr;  // what it runs
-  bool computes = false;               // its scope leaves it its processor
 
   void willBlock(BlockingKind kind) override;
   void hasBlocked() override;
@@ -455,11 +454,10 @@ WorkerPoolFigures WorkerPool::figures() const {
 }
 
 void WorkerPool::Worker::willBlock(BlockingKind kind) {
-  computes = kind == BlockingKind::computing;
-  if (!computes) pool->block(*this, kind == BlockingKind::inLine);
+  if (kind != BlockingKind::computing) pool->block(*this, kind == BlockingKind::inLine);
 }
 void WorkerPool::Worker::hasBlocked() {
-  if (!computes) pool->unblock(*this);
+  pool->unblock(*this);
 }
 
 }  // namespace kyt

@@ -9,7 +9,11 @@ namespace kyt {
 namespace {
 
 struct Diary final : BlockingObserver, HeldBack {
-  void willBlock(BlockingKind kind) override { text += kind == BlockingKind::inLine ? "stands " : "will "; }
+  void willBlock(BlockingKind kind) override {
+    text += kind == BlockingKind::inLine      ? "stands "
+            : kind == BlockingKind::computing ? "computes "
+                                              : "will ";
+  }
   void hasBlocked() override { text += "has "; }
   void giveAway() override { text += "gives "; }
   std::string text;
@@ -58,6 +62,20 @@ TEST(BlockingScope, SaysWhetherItStandsInLineForALock) {
   const Observed observed(diary);
   { const BlockingScope blocking(BlockingKind::inLine); }
   EXPECT_EQ(diary.text, "gives stands has ");
+}
+
+TEST(BlockingScope, TellsOfWaitsWhileItsThreadComputes) {
+  Diary diary;
+  const Observed observed(diary);
+  {
+    const BlockingScope computing(BlockingKind::computing);
+    EXPECT_EQ(diary.text, "gives computes ");
+    { const BlockingScope blocking; }
+    EXPECT_EQ(diary.text, "gives computes gives will has ");
+    const BlockingScope blocking;
+    const BlockingScope within(BlockingKind::computing);
+  }
+  EXPECT_EQ(diary.text, "gives computes gives will has gives will gives has ");
 }
 
 TEST(BlockingScope, ConcernsItsOwnThreadAlone) {

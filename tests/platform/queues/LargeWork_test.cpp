@@ -9,6 +9,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/base/Semaphore.h"
 #include "platform/queues/FairLock.h"
 #include "platform/queues/SerialQueue.h"
 #include "platform/queues/WorkerPool.h"
@@ -120,6 +121,24 @@ TEST(LargeWork, KeepsItsWorkersPlaceInThePoolAndLeavesOneToSmallWork) {
   EXPECT_EQ(pool.figures().workers, 5u) << "no worker more than those in line, those inside, and one";
   goOn = true;
   EXPECT_TRUE(eventually([&] { return pool.figures().idle == pool.figures().workers; }));
+  pool.shutDown();
+}
+
+TEST(LargeWork, LetsOthersRunWhereItWaitsAfterAll) {
+  WorkerPoolOptions options;
+  options.runnable = 1;
+  WorkerPool pool(options);
+  LargeWork work(1);
+  Semaphore goOn, over;
+  std::atomic<bool> wentOn{false};
+  SerialQueue::create("test.large", pool)->async([&] {
+    const LargeWork::Scope scope(work);
+    SerialQueue::create("test.small", pool)->async([&] { goOn.signal(); });
+    wentOn = goOn.waitFor(kTestDeadline);
+    over.signal();
+  });
+  over.wait();
+  EXPECT_TRUE(wentOn);
   pool.shutDown();
 }
 
