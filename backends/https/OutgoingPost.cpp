@@ -21,7 +21,7 @@ void OutgoingPost::send(std::string json) && {
   }
   request.events = events;
   reply.bytes = request.body.size();
-  reply.address = request.url.substr(0, request.url.find('?'));
+  reply.address = withoutPassword(request.url.substr(0, request.url.find('?')));
   poster->postURLRequestWithCompletionHandler(std::move(request), std::move(reply));
 }
 

@@ -41,7 +41,7 @@ struct PostReply {
   String name;
   FlushCompletion completion;
   PostedEvents events;  // that are delivered or lost with the message
-  std::string address;  // without what a "?" begins
+  std::string address;  // without a name and password, and without what a "?" begins
   std::shared_ptr<UserAccount> account;
   size_t bytes = 0;  // of the body
 

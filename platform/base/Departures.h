@@ -4,6 +4,7 @@
 // Callers: replies to posts and uploads, on any thread. Must not wait for long: a file may be looked at, not written.
 #pragma once
 
+#include <algorithm>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -35,15 +36,24 @@ class NoDepartures final : public Departures {
   void add(const Departure&) override {}
 };
 
-// "https://host:port" of an address, without a name and password before the host, which are for the server alone; the whole of
-// what has no such form.
-[[nodiscard]] inline std::string serverOf(std::string_view url) {
+// An address without a name and password before the host, which are for the server alone.
+[[nodiscard]] inline std::string withoutPassword(std::string_view url) {
   const size_t scheme = url.find("://");
   if (scheme == std::string_view::npos) return std::string(url);
   const size_t begin = scheme + 3;
-  std::string_view host = url.substr(begin, url.find_first_of("/?#", begin) - begin);
-  if (const size_t at = host.rfind('@'); at != std::string_view::npos) host.remove_prefix(at + 1);
-  return std::string(url.substr(0, begin)).append(host);
+  const std::string_view host = url.substr(begin, url.find_first_of("/?#", begin) - begin);
+  const size_t at = host.rfind('@');
+  const size_t rest = at != std::string_view::npos ? begin + at + 1 : begin;
+  return std::string(url.substr(0, begin)).append(url.substr(rest));
+}
+
+// "https://host:port" of an address, likewise; the whole of what has no such form.
+[[nodiscard]] inline std::string serverOf(std::string_view url) {
+  std::string server = withoutPassword(url);
+  const size_t scheme = server.find("://");
+  if (scheme != std::string::npos)
+    server.resize(std::min(server.find_first_of("/?#", scheme + 3), server.size()));
+  return server;
 }
 
 }  // namespace kyt
