@@ -11,6 +11,7 @@
 #include "platform/Bundle.h"
 #include "platform/Platform.h"
 #include "platform/PropertyLists.h"
+#include "platform/base/Departures.h"
 #include "platform/objects/Base64.h"
 #include "platform/objects/Description.h"
 #include "platform/objects/Keys.h"
@@ -114,15 +115,14 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
   Fetch<Dictionary> fetch;
   fetch.lastModified = lastModified;
   URLRequest request = storebagRequest(name, lastModified);
-  const std::string address = request.url;
-  fetch.address = address;
+  fetch.address = withoutPassword(request.url);
   const URLReply reply = startAndWait(std::move(request), [this](URLRequest sent, URLCompletion completion) {
     urlSession().start(std::move(sent), std::move(completion));
   });
   if (reply.error || !reply.response) {
     log.normal(
         "fetchStorebagWithName: Error resolving with lookup server %s, sendSynchronousRequest error %s",
-        address.c_str(), reply.error ? reply.error->localizedDescription.c_str() : "(null)");
+        fetch.address.c_str(), reply.error ? reply.error->localizedDescription.c_str() : "(null)");
     fetch.problem = reply.error ? reply.error->localizedDescription : "no answer";
     if (!name || *name != kFallbackStorebagName) return fetch;
     log.normal("fetchStorebagWithName: Loading default storebag '%s'", name->c_str());
@@ -156,7 +156,7 @@ StorebagFetcher::Fetch<Dictionary> StorebagFetcher::fetchStorebagWithName(
       fetch.result = std::move(*bag);
     }
   } else if (status < 200 || status > 299) {
-    log.normal("fetchStorebagWithName: %s answered with status %d", address.c_str(), status);
+    log.normal("fetchStorebagWithName: %s answered with status %d", fetch.address.c_str(), status);
     fetch.problem = "status " + std::to_string(status);
   }
   return fetch;

@@ -59,8 +59,8 @@ class StorebagFetcher {
     std::variant<Fetched, NotModified, Failed> result = Failed();
     int32_t maxAge = 0;                  // seconds; 0 when no reply came
     std::optional<String> lastModified;  // to ask with next time: the reply's, else the one asked with
-    std::string address;                 // where it was asked for; empty: nowhere
-    std::string problem;                 // why there is no good bag of the server's; empty: there is
+    std::string address;  // where it was asked for, without a name and password; empty: nowhere
+    std::string problem;  // why there is no good bag of the server's; empty: there is
   };
 
   StorebagFetcher(Configuration configuration, Mutex& backendClassLock, StorebagRefusals refusals = {});
