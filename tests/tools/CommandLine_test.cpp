@@ -67,6 +67,13 @@ TEST(CommandLineOfKytctl, NamesACommandThatThereIsNot) {
             "kytctl: A subcommand is required\nTry 'kytctl --help'.\n");
 }
 
+TEST(CommandLineOfKytctl, TakesNoValueOfAnOptionThatThereIsNotForACommand) {
+  for (const auto& [command, of] : std::vector<std::pair<std::vector<std::string>, std::string>>{
+           {{"--rot", "/tmp"}, "kytctl"}, {{"consent", "--rot", "/tmp", "stauts"}, "kytctl consent"}})
+    EXPECT_EQ(runProgram(KYT_PROGRAMS "/kytctl", command).text,
+              "kytctl: there is no option --rot without a command\nTry '" + of + " --help'.\n");
+}
+
 TEST(CommandLineOfKytctl, EndsWithAnErrorWhenItCannotWrite) {
   const TemporaryFolder root;
   const std::string program = std::string("'") + KYT_PROGRAMS "/kytctl' --root '" + root.path() + "' ";

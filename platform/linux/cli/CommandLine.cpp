@@ -34,12 +34,14 @@ const CLI::App& understood(const CLI::App& app) {
   return *at;
 }
 
-// Where a command is wanted and something else stands: CLI11 says only that one is wanted.
+// Where a command is wanted and something else stands: CLI11 says only that one is wanted. What is behind an option that
+// nobody knows may be its value.
 std::optional<std::string> unknownCommand(const CLI::App& app) {
   if (understood(app).get_require_subcommand_min() == 0) return std::nullopt;
-  for (const std::string& word : app.remaining(true))
-    if (!word.starts_with('-')) return "there is no command " + word;
-  return std::nullopt;
+  const std::vector<std::string> words = app.remaining(true);
+  if (words.empty()) return std::nullopt;
+  if (words.front().starts_with('-')) return "there is no option " + words.front() + " without a command";
+  return "there is no command " + words.front();
 }
 
 void complain(const CLI::App& app, const std::string& what) {
