@@ -557,6 +557,7 @@ class Session:
         """Sends what is queued, says goodbye and waits so many seconds at most; whether the daemon has taken all.
 
         Gives up at once where no daemon ever took anything and none is there. False also when it has ended before.
+        Ctrl-C, or another handler that raises, ends the waiting and the session at once: what is queued is lost.
         """
         if not isinstance(timeout, (int, float)):
             raise InvalidError(f"timeout must be a number of seconds, not a value of the type {type(timeout).__name__}")
@@ -567,16 +568,39 @@ class Session:
         for counter in list(self._counters):
             if not self._ended:
                 counter.send()
-        self._ended = True
-        return bool(lib.kyt_session_finish(self._pointer, milliseconds))
+        try:
+            self._ended = True
+            return self._say_goodbye(milliseconds)
+        except BaseException:
+            self.close()
+            raise
+
+    def _say_goodbye(self, milliseconds: int) -> bool:
+        """On the main thread by another one: handlers of signals run there, and not before a call of the library's returns."""
+
+        def say() -> bool:
+            return bool(lib.kyt_session_finish(self._pointer, milliseconds))
+
+        if threading.current_thread() is not threading.main_thread():
+            return say()
+        said: "concurrent.futures.Future[bool]" = concurrent.futures.Future()
+        try:
+            threading.Thread(target=lambda: said.set_result(say()), name="kyt-finish").start()
+        except RuntimeError:  # the system has none, or the interpreter ends
+            return say()
+        return said.result()
 
     def _has_sums(self) -> bool:
         return any(counter._has_sum() for counter in list(self._counters))
 
     async def afinish(self, timeout: float = 5.0) -> bool:
-        """finish() for asyncio: a thread of the loop's executor waits."""
+        """finish() for asyncio: a thread of the loop's executor waits. Cancelled, it ends the session at once."""
         finish = functools.partial(self.finish, timeout)
-        return await asyncio.get_running_loop().run_in_executor(None, finish)
+        try:
+            return await asyncio.get_running_loop().run_in_executor(None, finish)
+        except asyncio.CancelledError:
+            self.close()  # the end of the loop waits for that thread
+            raise
 
     def close(self) -> None:
         """Ends the session without waiting: what is queued is lost. No callback runs once it has returned."""

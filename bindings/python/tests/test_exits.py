@@ -250,3 +250,83 @@ def test_a_task_that_is_cancelled_as_it_ends_leaves_no_session(tmp_path, monkeyp
 
     figures = asyncio.run(end())
     assert (figures.queued, figures.lost_in_queue) == (0, 1)
+
+
+# A daemon that takes connections and says nothing: finish() would wait for its whole time. The interrupt comes when the
+# session is marked as ended, and thus within finish().
+_SILENT = """
+import asyncio, os, signal, socket, sys, threading, time
+import kytreporting as kyt
+silent = socket.socket(socket.AF_UNIX)
+silent.bind(os.environ["KYTREPORTING_SOCKET"])
+silent.listen()
+session = kyt.Session(20)
+session.send(1, 1)
+def interrupt(within):
+    def when_it_waits():
+        while not session._ended:
+            time.sleep(0.001)
+        os.kill(os.getpid(), signal.SIGINT)
+    threading.Thread(target=when_it_waits).start()
+    try:
+        within()
+    except KeyboardInterrupt:
+        print("interrupted")
+    silent.close()
+    print(session.finish(600), session.statistics().lost_in_queue)
+    try:
+        session.send(1, 1)
+    except kyt.ClosedError as error:
+        print(error)
+"""
+
+
+def test_ctrl_c_ends_finish_and_the_session_at_once(program, tmp_path):
+    said = program(_SILENT + "interrupt(lambda: session.finish(600))", KYTREPORTING_SOCKET=str(tmp_path / "silent"))
+    assert said == "interrupted\nFalse 1\nthe session is closed\n"
+
+
+def test_ctrl_c_ends_the_finish_at_the_end_of_a_with_statement_at_once(program, tmp_path):
+    said = program(
+        _SILENT
+        + """
+finish = session.finish
+session.finish = lambda timeout=600: finish(timeout)
+def within():
+    with session:
+        pass
+interrupt(within)
+""",
+        KYTREPORTING_SOCKET=str(tmp_path / "silent"),
+    )
+    assert said == "interrupted\nFalse 1\nthe session is closed\n"
+
+
+def test_ctrl_c_ends_a_finish_of_asyncio_at_once(program, tmp_path):
+    said = program(
+        _SILENT + "interrupt(lambda: asyncio.run(session.afinish(600)))", KYTREPORTING_SOCKET=str(tmp_path / "silent")
+    )
+    assert said == "interrupted\nFalse 1\nthe session is closed\n"
+
+
+def test_a_handler_that_returns_lets_finish_go_on(kyt_listener, program):
+    said = program(
+        """
+        import os, signal, threading, time
+        import kytreporting as kyt
+        handled = threading.Event()
+        signal.signal(signal.SIGUSR1, lambda number, frame: handled.set())
+        session = kyt.Session(20)
+        session.send(1, 1)
+        def interrupt():
+            while not session._ended:
+                time.sleep(0.001)
+            os.kill(os.getpid(), signal.SIGUSR1)
+        thread = threading.Thread(target=interrupt)
+        thread.start()
+        print(session.finish(600))
+        thread.join()
+        print(handled.wait(20))
+        """
+    )
+    assert said == "True\nTrue\n"
