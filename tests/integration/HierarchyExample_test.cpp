@@ -1,4 +1,5 @@
 // The worked example of docs/PROGRAMS.md, as it stands there.
+#include <regex>
 #include <sstream>
 
 #include "tests/integration/HierarchyFixture.h"
@@ -8,15 +9,15 @@ namespace {
 
 class HierarchyExample : public HierarchyTest {
  protected:
-  // The lines of the block that begins with "```jsonl example=NAME".
-  static std::vector<std::string> example(const std::string& name) {
+  // The lines of the block that begins with "```LANGUAGE example=NAME".
+  static std::vector<std::string> example(const std::string& name, const std::string& language = "jsonl") {
     std::istringstream document(contents(std::string(KYT_DOCUMENTS) + "/PROGRAMS.md"));
     std::vector<std::string> lines;
     bool inside = false;
     for (std::string line; std::getline(document, line);) {
       if (inside && line == "```") break;
       if (inside) lines.push_back(line);
-      if (line == "```jsonl example=" + name) inside = true;
+      if (line == "```" + language + " example=" + name) inside = true;
     }
     return lines;
   }
@@ -51,6 +52,18 @@ TEST_F(HierarchyExample, DoesWhatTheGuideSays) {
         line.find("\"ClientName\":\"stream\",\"ServiceName\":\"demo\"},\"payload\":{\"frames\":240}}}") !=
         std::string::npos;
   EXPECT_EQ(frames, 2U);
+  // The line that the guide shows, but for its time.
+  const std::regex time("\"timestamp\":[0-9]+(\\.[0-9]+)?,");
+  const std::vector<std::string> shown = example("aggregated", "json");
+  ASSERT_EQ(shown.size(), 1U);
+  const std::string timeless = std::regex_replace(shown[0], time, "");
+  EXPECT_NE(timeless, shown[0]);
+  EXPECT_EQ(std::count_if(rest.begin(), rest.end(),
+                          [&](const std::string& line) {
+                            return line != timeless && std::regex_replace(line, time, "") == timeless;
+                          }),
+            2)
+      << rest[0];
 
   ASSERT_TRUE(arrive("client=call&method=11", 1)) << daemonLog();
   ASSERT_TRUE(arrive("client=stream&method=12", 2)) << daemonLog();

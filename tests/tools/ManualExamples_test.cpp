@@ -1,6 +1,7 @@
 // The examples of the manual pages work: files are taken, commands and programs run beside a real daemon.
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <cstdlib>
 #include <regex>
 #include <utility>
@@ -126,6 +127,13 @@ TEST_F(ManualExamplesOnAStage, OfWatchHasTheColumnsThatTheProgramPrints) {
   for (const std::string& line : rows) EXPECT_TRUE(std::regex_match(line, row)) << line;
 }
 
+TEST_F(ManualExamplesOnAStage, OfExplainInTheProgrammersGuideRuns) {
+  const ProgramRun run = shell(blockOf("PROGRAMS.md", "sh example=explain"));
+  EXPECT_EQ(run.status, 0) << run.text;
+  EXPECT_NE(run.text.find("the event leaves"), std::string::npos) << run.text;
+  EXPECT_EQ(kytctl({"sessions", "--json"}).text, "{\"sessions\":[],\"all\":0}\n") << "nothing was sent";
+}
+
 TEST_F(ManualExamplesOnAStage, OfTheStorebagRun) {
   ASSERT_FALSE(tools::writeFile(stage_->folder() + "/dulvek.toml",
                                 exampleOf("kytreportingd-storebag.5", "storebag"), 0644));
@@ -220,6 +228,37 @@ TEST_F(ManualProgramsOnAStage, OfTheProgrammersGuideCompileAndReport) {
             "");
   EXPECT_EQ(shell("./guide").status, 0);
   EXPECT_TRUE(arrive("client=example&service=demo&method=10", 1)) << daemonLog();
+}
+
+// With all that it leaves to the reader: the word is made, and the handler set.
+TEST_F(ManualProgramsOnAStage, OfTheLastWordIsSentAndEndsAsWithoutIt) {
+  ASSERT_EQ(compile("crash", "c",
+                    "#include <kytreporting/kytreporting.h>\n#include <signal.h>\n#include <stdlib.h>\n" +
+                        blockOf("PROGRAMS.md", "c example=last-word") + R"(
+int main(int count, char** arguments) {
+  kyt_dictionary* info = kyt_dictionary_new();
+  kyt_dictionary_set_int(info, "ClientType", 20);
+  kyt_dictionary_set_int(info, "SessionID", 7);
+  kyt_dictionary_set_bool(info, "RequireUserInfo", 1);
+  kyt_dictionary* user = kyt_dictionary_new();
+  kyt_dictionary_set_string(user, "ClientName", "example");
+  kyt_dictionary_set_string(user, "ServiceName", "crash");
+  kyt_options options = {.size = sizeof options, .session_info = info, .user_info = user};
+  crashed = kyt_last_word_new(&options, 10, count > 1 ? (uint32_t)atoi(arguments[1]) : 0, NULL);
+  signal(SIGSEGV, on_crash);
+  signal(SIGABRT, on_crash);
+  raise(atoi(arguments[1]));
+  return 0;
+}
+)"),
+            "");
+  constexpr int kBySignal = 128;
+  for (const int number : {SIGSEGV, SIGABRT}) {
+    const ProgramRun run = shell("ulimit -c 0\n./crash " + std::to_string(number) + " || exit $?");
+    EXPECT_EQ(run.status, kBySignal + number) << run.text;
+    EXPECT_TRUE(arrive("client=example&service=crash&method=10&status=" + std::to_string(number), 1))
+        << daemonLog();
+  }
 }
 
 }  // namespace
