@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <regex>
 
 #include "tests/integration/StageFixture.h"
@@ -99,6 +100,50 @@ TEST(TestingAProgram, TheCommandsShowWhatItTold) {
                 R"({"event":"message","connection":1,"category":10,"type":1,"flag":0,"payload":{"step":1}})"),
             std::string::npos)
       << run.text;
+}
+
+TEST(TestingAProgram, MisspeltBackEndsAreRefusedWithThoseThatThereAre) {
+  const TemporaryFolder folder;
+  const Names names =
+      matchesIn(textOf("platform/objects/Keys.h"), "kKYTReportingBackend\\w+\\[\\] = \"(\\w+)\"");
+  ASSERT_GE(names.size(), 7U);
+  const auto listen = [&folder](const std::string& live) {
+    return runProgram("timeout", {"--preserve-status", "30", KYT_PROGRAMS "/kytctl", "listen", "--socket",
+                                  folder / "s", "--live", live});
+  };
+  for (const char* live : {"htttppost", "httppost,htttppost", "httppost, qrs", "HTTPPost"}) {
+    const ProgramRun run = listen(live);
+    EXPECT_EQ(run.status, 2) << live << run.text;
+    EXPECT_TRUE(run.text.starts_with("kytctl: --live: there is no back end \"")) << run.text;
+    const size_t list = run.text.find("; there are ");
+    ASSERT_NE(list, std::string::npos) << run.text;
+    EXPECT_EQ(matchesIn(run.text.substr(list + 12), "(\\w+)[,\n]"), names);
+  }
+  // The manual names them too.
+  const std::string section = sectionOf("kytctl.1", "kytctl listen");
+  for (const std::string& name : names)
+    EXPECT_TRUE(std::regex_search(section, std::regex("[ \n]" + name + "[ \n]"))) << name;
+}
+
+TEST(TestingAProgram, EachBackEndMayBeLive) {
+  const TemporaryFolder folder;
+  std::string all;
+  for (const std::string& name :
+       matchesIn(textOf("platform/objects/Keys.h"), "kKYTReportingBackend\\w+\\[\\] = \"(\\w+)\""))
+    all += (all.empty() ? "" : ",") + name;
+  for (const std::string& live : {all, std::string()}) {
+    const ProgramRun run =
+        shell(folder.path(), "kytctl listen --socket \"$PWD/s\" --live '" + live + R"(' > told & daemon=$!
+until [ -S s ]; do kill -0 $daemon; sleep 0.01; done
+printf '{"do":"open","sessionInfo":{"ClientType":20}}\n{"do":"configure"}\n{"do":"finish"}\n' |
+  kytctl session --socket "$PWD/s" -
+kill $daemon; wait $daemon
+)");
+    std::string told = live;
+    std::replace(told.begin(), told.end(), ',', ' ');
+    EXPECT_EQ(run.status, 0) << run.text;
+    EXPECT_TRUE(run.text.starts_with(live.empty() ? "live:" : "live: " + told + "\n")) << run.text;
+  }
 }
 
 TEST(DemonstrationAroundAProgram, TellsWhatArrivedAndWhatWasDroppedAndWhy) {

@@ -2,12 +2,16 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
+#include <iterator>
 #include <utility>
 
 #include "kytreporting/FakeDaemon.h"
 #include "platform/base/Hex.h"
 #include "platform/base/TextEscape.h"
+#include "platform/linux/cli/CommandLine.h"
+#include "platform/objects/Keys.h"
 #include "tools/kytctl/Commands.h"
 
 namespace kyt::tools {
@@ -44,6 +48,23 @@ void print(const Dictionary& line) {
   std::fflush(stdout);
 }
 
+constexpr const char* kBackEnds[] = {kKYTReportingBackendHTTPPost,     kKYTReportingBackendHTTPPost2,
+                                     kKYTReportingBackendQRS,          kKYTReportingBackendDashboard,
+                                     kKYTReportingBackendUploadServer, kKYTReportingBackendQDX,
+                                     kKYTReportingBackendAmpyx};
+
+// Says so, where one of the names is no back end's.
+bool areBackEnds(const std::vector<std::string>& names) {
+  const auto wrong = std::find_if(names.begin(), names.end(), [](const std::string& name) {
+    return std::find(std::begin(kBackEnds), std::end(kBackEnds), name) == std::end(kBackEnds);
+  });
+  if (wrong == names.end()) return true;
+  std::string known;
+  for (const char* name : kBackEnds) known += (known.empty() ? "" : ", ") + std::string(name);
+  failed("--live: there is no back end \"" + escapedText(*wrong) + "\"; there are " + known);
+  return false;
+}
+
 std::vector<std::string> namesIn(const std::string& list) {
   std::vector<std::string> names;
   for (size_t begin = 0; begin <= list.size();) {
@@ -57,6 +78,8 @@ std::vector<std::string> namesIn(const std::string& list) {
 }  // namespace
 
 int listenCommand(const ListenOptions& given) {
+  std::vector<std::string> live = namesIn(given.live);
+  if (!areBackEnds(live)) return kWrongUsage;
   // The daemon's threads inherit the mask: the signals come to this one.
   sigset_t set;
   sigemptyset(&set);
@@ -66,7 +89,7 @@ int listenCommand(const ListenOptions& given) {
 
   testing::FakeDaemon::Options options;
   options.socketPath = given.socket;
-  options.live = namesIn(given.live);
+  options.live = std::move(live);
   options.storebag = !given.noStorebag;
   options.refuse = given.refuse;
   options.dieAfter = given.dieAfter;
