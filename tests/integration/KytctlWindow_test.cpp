@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <regex>
 #include <sstream>
 #include <string>
 #include <variant>
@@ -394,6 +395,35 @@ TEST_F(KytctlWindow, SaysThatTheDaemonRunsWithoutItsAdministrationSocket) {
                           ", and has no administration socket"),
             std::string::npos)
       << run.text;
+}
+
+TEST_F(KytctlWindow, FoldsTheLinesOfAReloadAndLosesNothing) {
+  lay();
+  startDaemon();
+  const std::string settings = stage_->folder() + "/etc/kytreportingd/kytreportingd.toml";
+  // Words, a path without a blank that takes lines, and letters of two bytes.
+  const std::string path = stage_->folder() + "/server/" + std::string(120, 'x') + " \u00fc\u00fc " +
+                           std::string(50, 'y') + "/ca.pem";
+  ASSERT_FALSE(tools::writeFile(settings,
+                                std::regex_replace(contents(settings), std::regex("ca_file = \"[^\"]+\""),
+                                                   "ca_file = \"" + path + "\""),
+                                0644));
+  const Dictionary answer = json({"reload"});
+  const Array* lines = answer.array("settings");
+  ASSERT_TRUE(lines != nullptr && lines->size() == 1);
+  const std::string line = (*lines)[0].string()->str();
+  ASSERT_NE(line.find(path), std::string::npos) << line;
+  const std::string folded = columns({"reload"});
+  EXPECT_GT(linesOf(folded).size(), 2U) << folded;
+  std::string joined;
+  for (const std::string& part : linesOf(folded)) {
+    EXPECT_EQ(part.starts_with("      "), !joined.empty()) << folded;
+    joined += part;
+  }
+  const auto withoutBlanks = [](const std::string& text) {
+    return std::regex_replace(text, std::regex("[ \n]"), "");
+  };
+  EXPECT_EQ(withoutBlanks(joined), withoutBlanks(line));
 }
 
 // A collector's file that a full disk has cut would stand in place of a whole one.

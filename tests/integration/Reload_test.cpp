@@ -127,14 +127,16 @@ TEST_F(Reload, KeepsTheCertificateAuthoritiesWhereTheNewFileHasNone) {
   const auto use = [&](const std::string& file) {
     settings_ = std::regex_replace(good, std::regex("ca_file = \"[^\"]+\""), "ca_file = \"" + file + "\"");
     write("");
-    return kytctl({"reload"}).text;
+    return kytctl({"reload", "--json"}).text;
   };
-  EXPECT_EQ(use(empty), "tls.ca_file: not taken up: " + empty + " holds no certificates that can be read\n");
+  EXPECT_EQ(use(empty), "{\"settings\":[\"tls.ca_file: not taken up: " + empty +
+                            " holds no certificates that can be read\"]}\n");
   EXPECT_EQ(send("person", 3), 0);
   EXPECT_TRUE(arrive("client=person&method=3", 1)) << "those of before hold";
   const std::string missing = stage_->folder() + "/server/missing.pem";
-  EXPECT_EQ(use(missing), "tls.ca_file: counts after a restart, the daemon that runs cannot read " + missing +
-                              ": No such file or directory\n");
+  EXPECT_EQ(use(missing),
+            "{\"settings\":[\"tls.ca_file: counts after a restart, the daemon that runs cannot read " +
+                missing + ": No such file or directory\"]}\n");
   settings_ = good;
   write("");
   EXPECT_EQ(kytctl({"reload"}).text, "no setting has changed\n");

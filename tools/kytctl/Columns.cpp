@@ -12,6 +12,17 @@ namespace kyt::tools {
 
 namespace {
 
+// Of lines that go on, or belong to the one above.
+constexpr std::string_view kIndent = "      ";
+
+// How many bytes of a text of UTF-8 so many characters take, at most all.
+size_t bytesOf(std::string_view text, size_t characters) {
+  size_t end = 0;
+  for (; end < text.size() && characters > 0; --characters)
+    end += std::max<size_t>(utf8SequenceLength(text.substr(end)), 1);
+  return end;
+}
+
 std::tm localTime(int64_t seconds) {
   const std::time_t time = seconds;
   std::tm local{};
@@ -29,12 +40,24 @@ size_t charactersIn(std::string_view text) {
 std::string cutText(std::string_view text, size_t most) {
   std::string shown = escapedText(text);
   if (charactersIn(shown) <= most) return shown;
-  size_t end = 0, count = 0;
-  while (end < shown.size() && count + 1 < most) {
-    end += std::max<size_t>(utf8SequenceLength(std::string_view(shown).substr(end)), 1);
-    ++count;
-  }
-  return shown.substr(0, end) + "…";
+  return shown.substr(0, bytesOf(shown, std::max<size_t>(most, 1) - 1)) + "…";
+}
+
+std::string foldedText(std::string_view text) {
+  const std::string shown = escapedText(text);
+  std::string lines;
+  std::string_view rest = shown, indent;
+  do {
+    const size_t most = bytesOf(rest, kMostCharacters - indent.size());
+    const size_t blank = most < rest.size() ? rest.rfind(' ', most - 1) : std::string_view::npos;
+    const size_t end = blank != std::string_view::npos && blank >= most / 2 ? blank + 1 : most;
+    std::string_view line = rest.substr(0, end);
+    rest.remove_prefix(end);
+    if (!rest.empty() && line.ends_with(' ')) line.remove_suffix(1);
+    lines.append(indent).append(line).append("\n");
+    indent = kIndent;
+  } while (!rest.empty());
+  return lines;
 }
 
 void Columns::add(std::vector<std::string> row) {
@@ -45,7 +68,6 @@ void Columns::add(std::vector<std::string> row) {
 }
 
 void Columns::addNote(std::string_view text) {
-  constexpr std::string_view kIndent = "      ";
   notes_.back().append(kIndent).append(cutText(text, kMostCharacters - kIndent.size())).append("\n");
 }
 

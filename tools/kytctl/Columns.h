@@ -36,6 +36,9 @@ class Columns {
 [[nodiscard]] size_t charactersIn(std::string_view text);
 // Escaped, and cut to so many characters.
 [[nodiscard]] std::string cutText(std::string_view text, size_t most);
+// Escaped, in lines of at most kMostCharacters, each with its line feed: the second and further ones stand further to the
+// right. They end behind a blank where one is in their second half.
+[[nodiscard]] std::string foldedText(std::string_view text);
 // "12:03:59" today, otherwise "2026-11-22 12:03", by the local clock; "never" for 0.
 [[nodiscard]] std::string clockText(int64_t seconds, int64_t now);
 // "17 s", "5 min", "3 h", "2 d".

@@ -227,7 +227,7 @@ int reloadCommand(const std::string& root, bool json) {
   if (const auto* error = std::get_if<Error>(&answer)) return failedAtWindow(*error);
   Array lines;
   for (const std::string& line : std::get<std::vector<std::string>>(answer)) {
-    if (!json) std::printf("%s\n", escapedText(line).c_str());
+    if (!json) std::fputs(foldedText(line).c_str(), stdout);
     lines.append(Value(line));
   }
   if (json) printJSON(Dictionary{{"settings", std::move(lines)}});
