@@ -1,12 +1,14 @@
 // The same steps of a program against the daemon for tests and the real one: what the program sees is the same.
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <future>
 #include <sstream>
 
 #include "kytreporting/FakeDaemon.h"
 #include "kytreporting/KYTReporting.h"
 #include "tests/integration/StageFixture.h"
+#include "tests/support/Eventually.h"
 
 namespace kyt {
 namespace {
@@ -29,8 +31,10 @@ std::string shown(const std::optional<Error>& error) {
 // One program's session, each answer as a line.
 class Program {
  public:
-  Program(const std::string& socket, SessionInfo info) {
+  Program(const std::string& socket, SessionInfo info,
+          std::chrono::milliseconds deadline = std::chrono::seconds(30)) {
     KYTReporting::Options options;
+    options.callDeadline = deadline;
     options.socketPath = socket;
     options.sessionInfo = std::move(info);
     options.userInfo = Dictionary{{"ClientName", "person"}, {"ServiceName", "demo"}};
@@ -79,6 +83,10 @@ class Program {
     const auto figures = session_->statistics();
     said_ << "accepted " << figures.accepted << " sent " << figures.sent << " unconfigured "
           << figures.sentUnconfigured << '\n';
+  }
+  void waitUntilRefused() {
+    EXPECT_TRUE(eventually([this] { return session_->state() == KYTReporting::State::refused; }));
+    said_ << session_->stateReason() << '\n';
   }
   [[nodiscard]] std::string said() const { return said_.str(); }
 
@@ -226,6 +234,80 @@ TEST_F(FakeDaemonLikeness, SingleMessages) {
                                  Dictionary{{"SessionID", 5U}, {"ClientType", 2}},
                                  Dictionary{{"SessionID", 5U}}, Dictionary{{"ClientType", 20}}, Dictionary()})
     EXPECT_EQ(sentSingly(socket(), info), sentSingly(fake_.socketPath(), info)) << description(info);
+}
+
+// A daemon without a grant for this program, and `kytctl listen --refuse`.
+class RefusalLikeness : public StageTest {
+ protected:
+  void SetUp() override {
+    lay();
+    std::filesystem::remove(stage_->folder() + "/etc/kytreportingd/entitlements.d/stage.toml");
+    startDaemon();
+    tools::ChildProcess::Options how;
+    how.outputFile = folder_ / "told";
+    listener_ = tools::ChildProcess::start(stage_->program("kytctl"),
+                                           {"listen", "--refuse", "--socket", folder_ / "s"}, how);
+    ASSERT_TRUE(listener_);
+    ASSERT_TRUE(eventually([this] { return folder_.read("told").ends_with("\n"); }));
+  }
+  // What `told` answers of each socket, once both were compared with the socket's path left out.
+  template <typename Told>
+  std::string compared(Told told) {
+    const auto from = [&told](const std::string& path) {
+      std::string text = told(path);
+      for (size_t at = 0; (at = text.find(path, at)) != std::string::npos;)
+        text.replace(at, path.size(), "SOCKET");
+      return text;
+    };
+    const std::string fake = from(folder_ / "s");
+    EXPECT_EQ(from(socket()), fake);
+    return fake;
+  }
+  TemporaryFolder folder_;
+  std::optional<tools::ChildProcess> listener_;
+};
+
+TEST_F(RefusalLikeness, ASession) {
+  const std::string said = compared([](const std::string& path) {
+    Program program(path, {.sessionID = 5, .clientType = 20, .batchEvent = true},
+                    std::chrono::milliseconds(200));
+    program.waitUntilRefused();
+    program.configure();
+    program.states();
+    program.send();
+    program.flush();
+    program.uploadLogData();
+    program.finish();
+    program.waitUntilRefused();
+    return program.said();
+  });
+  EXPECT_NE(said.find("configure: error 6: no daemon within 0.2 s: SOCKET: "), std::string::npos) << said;
+}
+
+TEST_F(RefusalLikeness, ASingleMessage) {
+  const std::string said = compared([](const std::string& path) {
+    return sentSingly(path, Dictionary{{"SessionID", 5U}, {"ClientType", 20}});
+  });
+  EXPECT_NE(said.find("SOCKET: the connection ended before the daemon answered: "), std::string::npos)
+      << said;
+}
+
+TEST_F(RefusalLikeness, Programs) {
+  const std::string script = folder_.write("script",
+                                           "{\"do\":\"open\",\"sessionInfo\":{\"ClientType\":20}}\n"
+                                           "{\"do\":\"configure\"}\n");
+  const std::vector<std::vector<std::string>> commands = {
+      {"send", "--client-type", "20", "--category", "1", "--type", "2"},
+      {"session", "--timeout", "600", script}};
+  for (const std::vector<std::string>& command : commands) {
+    const std::string said = compared([&](const std::string& path) {
+      std::vector<std::string> arguments = command;
+      arguments.insert(arguments.begin() + 1, {"--socket", path});
+      const ProgramRun run = kytctl(arguments);
+      return std::to_string(run.status) + " " + run.text;
+    });
+    EXPECT_NE(said.find("the daemon refuses this user and program"), std::string::npos) << said;
+  }
 }
 
 }  // namespace

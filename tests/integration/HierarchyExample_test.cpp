@@ -1,4 +1,5 @@
 // The worked example of docs/PROGRAMS.md, as it stands there.
+#include <algorithm>
 #include <regex>
 #include <sstream>
 
