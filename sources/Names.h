@@ -27,7 +27,7 @@ class SystemNames {
   // folders.
   [[nodiscard]] std::string unit(std::string_view unit);
   // The path itself where root owns a file there that a package brought; without lists, where it lies below /usr (but
-  // /usr/local), /bin, /sbin or /lib.
+  // /usr/local), /bin, /sbin, /lib, /lib32 or /lib64.
   [[nodiscard]] std::string program(std::string_view path);
 
  private:

@@ -57,14 +57,21 @@ class Resources {
 
  private:
   void report() {
-    if (begun_ && !handOver(*begun_).isWhole()) return;
+    if (begun_ && !handOver(*begun_).isWhole()) {
+      ++waits_;
+      return;
+    }
     begun_.reset();
     Dictionary fields = period_.summary();
     fields.set("waits", waits_);
     fields.set("report", state_.report);
     SourceEvent event{kCategory, kResources, std::move(fields)};
     const Handover handover = handOver(event);
-    if (!handover.offered) return;
+    if (!handover.offered) {
+      ++waits_;
+      return;
+    }
+    waits_ = handover.isWhole() ? 0 : 1;  // those before stand in this one
     period_.restart();
     // Its number is used, whatever became of it.
     ++state_.report;
@@ -73,7 +80,6 @@ class Resources {
   }
   Handover handOver(const SourceEvent& event) {
     Handover handover = delivery_.deliver({event});
-    waits_ = handover.isWhole() ? 0 : waits_ + 1;
     voice_.tell(handover.isWhole() ? std::string() : "the summary waits: " + delivery_.problem());
     return handover;
   }
@@ -85,7 +91,7 @@ class Resources {
   State state_;
   // Handed over, and the daemon did not say that it has it: it is tried again as it is.
   std::optional<SourceEvent> begun_;
-  uint64_t waits_ = 0;
+  uint64_t waits_ = 0;  // that no report has told yet
 };
 
 }  // namespace

@@ -235,6 +235,32 @@ TEST_F(BootsSource, ReportsEachRunOnceWithTheFieldsThatItsEventsFileNames) {
   EXPECT_EQ(startups, 1);
 }
 
+TEST_F(BootsSource, ReportsTheLatestHundredOfMoreRuns) {
+  lay("boots", "gelmar");
+  const auto start = [&](const std::string& boot) {
+    return SourceOnAStage::run({"--journal", journal_.folder(), "--state", folder_ / "state", "--root",
+                                folder_ / "root", "--boot", boot})
+        .status;
+  };
+  run(kFirst);
+  journal_.write();
+  EXPECT_EQ(start(kFirst), 0);
+  constexpr int kRuns = 102, kMost = 100;
+  for (int i = 0; i < kRuns; ++i) run(std::string(29, 'e') + std::to_string(i + 100));
+  journal_.write();
+  EXPECT_EQ(start(kSecond), 0);
+  // The first start, those, and the second start. What was left out, the first run and two more, is not told later.
+  EXPECT_EQ(arrived(303, 1 + kMost + 1).size(), static_cast<size_t>(1 + kMost + 1));
+  std::set<int64_t> ends;
+  for (const Dictionary& event : arrived(303, 1))
+    if (const Dictionary& record = *event.dictionary("record"); record.contains("ended"))
+      ends.insert(record.integer("ended"));
+  EXPECT_EQ(ends.size(), static_cast<size_t>(kMost));
+  EXPECT_NEAR(static_cast<double>(*ends.rbegin() - *ends.begin()), (kMost - 1) * 3600.0, 1);
+  EXPECT_EQ(start(kSecond), 0);
+  EXPECT_EQ(arrived(303, 1).size(), static_cast<size_t>(1 + kMost + 1));
+}
+
 TEST_F(BootsSource, ReportsOnceTheDaemonHasAStorebagWhatItFoundBefore) {
   lay("boots", "gelmar");
   run(kFirst);

@@ -86,6 +86,11 @@ TEST_F(ReportedProgram, IsNamedOnceItsPackageIsInstalled) {
 TEST_F(ReportedProgram, IsNamedWithoutListsWherePackagesAloneShouldWrite) {
   SystemNames names({{}, root_ / "none", root_.path()});
   EXPECT_EQ(names.program("/usr/bin/tool"), "/usr/bin/tool");
+  for (const char* folder : {"bin", "sbin", "lib", "lib32", "lib64"}) {
+    const std::string program = std::string("/") + folder + "/tool";
+    root_.write(program.substr(1), "");
+    EXPECT_EQ(names.program(program), program);
+  }
   for (const char* program : {"/opt/maker/tool", "/usr/local/bin/tool", "/tmp/tool", "/usr/bin/theirs",
                               "/usr/bin/no-such-program", "/usr/../tmp/tool"})
     EXPECT_EQ(names.program(program), kLocal) << program;

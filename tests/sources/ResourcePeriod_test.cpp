@@ -2,6 +2,7 @@
 #include "sources/resources/ResourcePeriod.h"
 
 #include <gtest/gtest.h>
+#include <sys/statvfs.h>
 
 #include "tests/support/TemporaryFolder.h"
 
@@ -82,10 +83,15 @@ TEST_F(ResourcePeriodOf, HasTheTemperatureOfTheHottestZone) {
   EXPECT_DOUBLE_EQ(value("temperatureMax"), 52.5);
 }
 
-TEST_F(ResourcePeriodOf, HasTheShareOfTheDiskThatIsUsed) {
+TEST_F(ResourcePeriodOf, HasTheShareOfTheDiskThatIsNotFreeForPrograms) {
   root_.write("var/file", "");
   look(1);
   fields_ = period_.summary();
+  struct statvfs disk = {};
+  ASSERT_EQ(::statvfs((root_ / "var").c_str(), &disk), 0);
+  constexpr double kMeanwhile = 0.02;  // what others write
+  EXPECT_NEAR(value("diskMean"), 1 - static_cast<double>(disk.f_bavail) / static_cast<double>(disk.f_blocks),
+              kMeanwhile);
   EXPECT_GE(value("diskMin"), 0);
   EXPECT_LE(value("diskMax"), 1);
 }

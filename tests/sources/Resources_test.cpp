@@ -65,12 +65,15 @@ TEST_F(ResourcesSource, TriesAReportAgainAsItWasThatADaemonGotAndDidNotAnswer) {
   const auto first = messages(*daemon).front().payload;
   daemon.reset();
   daemon = listen(0);
-  ASSERT_TRUE(tools::waitUntil(std::chrono::seconds(60), [&] { return messages(*daemon).size() >= 2; }))
+  ASSERT_TRUE(tools::waitUntil(std::chrono::seconds(60), [&] { return messages(*daemon).size() >= 3; }))
       << folder_.read("output");
   program_->signal(SIGTERM);
   EXPECT_EQ(program_->wait(std::chrono::seconds(60)), 0);
   EXPECT_EQ(messages(*daemon)[0].payload, first);
   EXPECT_EQ(messages(*daemon)[1].payload.integer("report"), first.integer("report") + 1);
+  EXPECT_EQ(first.integer("waits"), 0);
+  EXPECT_GE(messages(*daemon)[1].payload.integer("waits"), 1) << "the first was not taken at once";
+  EXPECT_EQ(messages(*daemon)[2].payload.integer("waits"), 0) << "told by the one before";
 }
 
 TEST_F(ResourcesSource, GoesOnSummingUpWhereThereIsNoDaemon) {
