@@ -110,6 +110,52 @@ TEST(ContributingDocument, NamesOnlyWhatTheCodeKnows) {
   EXPECT_EQ(unknownNamesIn(places), Names());
 }
 
+// The packages of a list: one a line, a remark after "#".
+Names packagesOfTheBuild() {
+  Names packages;
+  for (const std::string& line : linesOf(textOf("packaging/build-deps")))
+    if (const std::string package = line.substr(0, line.find_first_of(" #")); !package.empty())
+      packages.insert(package);
+  return packages;
+}
+
+TEST(BuildDependencies, OfTheLanguagesOfExamplesAreNamedByBothGuidesAndNotNeeded) {
+  const std::string script = textOf("tests/install/check-quickstarts");
+  Names packages = matchesIn(script, "\"([a-z-]+) is not installed\"");
+  packages.merge(matchesIn(script, "lacks [a-z]+ ([a-z-]+)"));
+  packages.erase("systemd");
+  EXPECT_EQ(packages.size(), 7U);
+  const Names guide = quotedIn(textOf("docs/PROGRAMS.md")),
+              contributing = quotedIn(textOf("CONTRIBUTING.md")), needed = packagesOfTheBuild();
+  for (const std::string& package : packages) {
+    EXPECT_TRUE(guide.contains(package)) << package;
+    EXPECT_TRUE(contributing.contains(package)) << package;
+    EXPECT_FALSE(needed.contains(package)) << package;
+  }
+}
+
+TEST(BuildDependencies, OfTheDebianPackagesAreThoseOfTheBuildWithoutTests) {
+  const std::string control = textOf("packaging/debian/control");
+  const size_t begin = control.find("\nBuild-Depends:\n"), end = control.find("\n\n", begin);
+  ASSERT_NE(begin, std::string::npos);
+  const Names named = matchesIn(control.substr(begin, end - begin), "\n ([a-z0-9-]+)");
+  const Names needed = packagesOfTheBuild();
+  for (const std::string& package : named)
+    EXPECT_TRUE(needed.contains(package) || package.starts_with("debhelper-compat") ||
+                package.starts_with("dh-sequence-"))
+        << package;
+  // What only tests have; the compilers are on any machine that builds packages.
+  const Names tests = {"libclang-rt-14-dev", "libgtest-dev", "libgmock-dev"};
+  for (const std::string& package : needed)
+    if (package.ends_with("-dev") && package != "dpkg-dev") {
+      EXPECT_NE(named.contains(package), tests.contains(package)) << package;
+    }
+  // As long as that build runs none.
+  const std::string rules = textOf("packaging/debian/rules");
+  EXPECT_NE(rules.find("-DKYT_TESTS=OFF"), std::string::npos);
+  EXPECT_NE(rules.find("\noverride_dh_auto_test:\n\n"), std::string::npos);
+}
+
 TEST(ArchitectureDocument, NamesOnlyFilesAndFoldersThatThereAre) {
   const Names paths = pathsIn(textOf("docs/ARCHITECTURE.md"));
   EXPECT_GE(paths.size(), 15U);

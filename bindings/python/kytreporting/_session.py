@@ -576,7 +576,7 @@ class Session:
             raise
 
     def _say_goodbye(self, milliseconds: int) -> bool:
-        """On the main thread by another one: handlers of signals run there, and not before a call of the library's returns."""
+        """On the main thread by another one: there signals are handled, and not before a call of the library's returns."""
 
         def say() -> bool:
             return bool(lib.kyt_session_finish(self._pointer, milliseconds))
