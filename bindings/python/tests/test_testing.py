@@ -29,6 +29,12 @@ def test_a_listener_says_that_it_cannot_listen(tmp_path, capfd):
     assert "kytctl: " in capfd.readouterr().err
 
 
+def test_a_listener_says_that_a_back_end_is_misspelt(capfd):
+    with pytest.raises(RuntimeError, match="status 2"):
+        Listener(live="htttppost").start()
+    assert 'there is no back end "htttppost"; there are httppost, ' in capfd.readouterr().err
+
+
 def test_every_text_comes_back_as_it_was(kyt_listener):
     texts = ["a\u2028b", "\x7f", "\x85", "\u202e", "\u2066", "tab\tline\n", 'quote " and \\', "\U0001f600", "\x01"]
     with kyt.Session(20) as session:
