@@ -31,8 +31,8 @@ __all__ = ["Listener"]
 class Listener:
     """Stands in for the daemon at `socket_path` until stop() or the end of its with statement.
 
-    live: the live back ends of each session, parted by commas; storebag: whether there is one; refuse: serve nobody; die_after: end as if
-    killed after so many messages. `kytctl` is the program, found on the path otherwise.
+    live: the live back ends of each session, parted by commas; storebag: whether there is one; refuse: serve nobody;
+    die_after: end as if killed after so many messages. `kytctl` is the program, found on the path otherwise.
     """
 
     def __init__(
