@@ -77,11 +77,13 @@ std::variant<std::string, Error> readFile(const std::string& path) {
 
 std::optional<Error> writeFile(const std::string& path, std::string_view bytes, unsigned mode) {
   struct stat there = {};
+  const Error irregular{"KYTToolsErrorDomain", 1, path + " is no regular file"};
+  if (stat(path.c_str(), &there) == 0 && S_ISBLK(there.st_mode))
+    return irregular;  // a disk, by whatever name
   if (isInFolderOfDevices(path)) return writeInto(path, bytes);
   if (lstat(path.c_str(), &there) == 0) {
     if (S_ISCHR(there.st_mode)) return writeInto(path, bytes);
-    if (S_ISFIFO(there.st_mode) || S_ISSOCK(there.st_mode) || S_ISBLK(there.st_mode))
-      return Error{"KYTToolsErrorDomain", 1, path + " is no regular file"};
+    if (S_ISFIFO(there.st_mode) || S_ISSOCK(there.st_mode)) return irregular;
   }
   std::string temporary = path + ".XXXXXX";
   const int fd = mkostemp(temporary.data(), O_CLOEXEC);

@@ -40,6 +40,20 @@ TEST_F(FilesOfTools, LeaveADevice) {
   EXPECT_EQ(kindOf(full), mode_t{S_IFCHR});
 }
 
+TEST_F(FilesOfTools, LeaveADiskUnderWhateverName) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root";
+  const std::string disk = folder_ / "disk", link = folder_ / "link";
+  if (mknod(disk.c_str(), S_IFBLK | 0600, makedev(240, 1)) != 0) GTEST_SKIP() << "no disk can be made here";
+  std::filesystem::create_symlink(disk, link);
+  for (const std::string& name : {disk, link}) {
+    const auto error = tools::writeFile(name, "text", 0600);
+    ASSERT_TRUE(error) << name;
+    EXPECT_EQ(error->localizedDescription, name + " is no regular file");
+  }
+  EXPECT_EQ(kindOf(disk), mode_t{S_IFBLK});
+  EXPECT_EQ(kindOf(link), mode_t{S_IFLNK});
+}
+
 TEST_F(FilesOfTools, WriteToWhatIsOpenByItsPath) {
   int ends[2];
   ASSERT_EQ(pipe2(ends, O_CLOEXEC), 0);
