@@ -79,6 +79,8 @@ int listSpool(const Settings& settings) {
       std::printf("%lld %s %s %llu bytes %s\n", static_cast<long long>(post.number), post.id.c_str(), time,
                   static_cast<unsigned long long>(post.bytes), post.sender.c_str());
   }
+  // Who redirects it to a file would take a part for the whole.
+  if (std::fflush(stdout) != 0 || std::ferror(stdout) != 0) return fail("can't write the output");
   return 0;
 }
 

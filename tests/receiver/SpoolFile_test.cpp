@@ -93,6 +93,9 @@ TEST_F(SpoolForPeople, IsListedAndAPostRemovedWhileNoReceiverHasIt) {
       both.text, std::regex("1 [0-9a-f]{64} 20[0-9-]{8}T[0-9:]{8}Z [0-9]+ bytes QPW/c\xc3\xa4\n"
                             "2 [0-9a-f]{64} 20[0-9-]{8}T[0-9:]{8}Z [0-9]+ bytes QPW/c\xc3\xa4\n")))
       << both.text;
+  const ProgramRun full = runProgram(
+      "/bin/sh", {"-c", KYT_RECEIVER " --config \"$0\" --list-spool >/dev/full", receiver_->configFile()});
+  EXPECT_EQ(full.status, 1) << "a part would be taken for the whole";
   EXPECT_EQ(run({"--remove-from-spool", "3"}).status, 1);
   EXPECT_EQ(run({"--remove-from-spool", "1"}).status, 0);
   EXPECT_TRUE(run({"--list-spool"}).text.starts_with("2 "));
