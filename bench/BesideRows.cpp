@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdio>
 #include <fstream>
 #include <optional>
 #include <sstream>
@@ -79,7 +80,7 @@ void measureBeside(const Surroundings& surroundings) {
   const auto watched = standFor(surroundings, "");
   if (watched == nullptr) return;
   auto watcher = startDeafWatcher(*watched, surroundings);
-  if (!watcher) return;
+  if (!watcher) return static_cast<void>(std::fprintf(stderr, "kytctl watch came not so far as to watch\n"));
   measurePairs(rows::kDeafWatcher, *watched, *bare, surroundings);
   watcher->signal(SIGCONT);
 }
