@@ -21,6 +21,10 @@ find_package(Threads REQUIRED)
 add_library(kyt_options INTERFACE)
 target_include_directories(kyt_options INTERFACE ${CMAKE_SOURCE_DIR})
 target_link_libraries(kyt_options INTERFACE Threads::Threads)
+# Where a long has 32 bits: sizes of files, limits and times of 64 all the same.
+if(CMAKE_SIZEOF_VOID_P EQUAL 4)
+  target_compile_definitions(kyt_options INTERFACE _FILE_OFFSET_BITS=64 _TIME_BITS=64)
+endif()
 target_compile_options(kyt_options INTERFACE
   -Wall -Wextra -Wpedantic -Werror -Wshadow -Wformat=2 -fno-omit-frame-pointer
   $<$<COMPILE_LANGUAGE:CXX>:-Wnon-virtual-dtor -Wunused-result>

@@ -289,12 +289,11 @@ class KYT_OBJECT Value {
   Value(std::nullptr_t) noexcept : Value() {}                           // NOLINT(google-explicit-constructor)
   Value(bool value) noexcept;                                           // NOLINT(google-explicit-constructor)
   Value(int value) noexcept : Value(static_cast<int64_t>(value)) {}     // NOLINT(google-explicit-constructor)
-  Value(long value) noexcept;                                           // NOLINT(google-explicit-constructor)
-  Value(long long value) noexcept : Value(static_cast<long>(value)) {}  // NOLINT(google-explicit-constructor)
-  Value(unsigned value) noexcept
-      : Value(static_cast<unsigned long>(value)) {}  // NOLINT(google-explicit-constructor)
-  Value(unsigned long value) noexcept;               // NOLINT(google-explicit-constructor)
-  Value(unsigned long long value) noexcept : Value(static_cast<unsigned long>(value)) {}  // NOLINT
+  Value(long value) noexcept : Value(static_cast<long long>(value)) {}  // NOLINT(google-explicit-constructor)
+  Value(long long value) noexcept;                                      // NOLINT(google-explicit-constructor)
+  Value(unsigned value) noexcept : Value(static_cast<unsigned long long>(value)) {}       // NOLINT
+  Value(unsigned long value) noexcept : Value(static_cast<unsigned long long>(value)) {}  // NOLINT
+  Value(unsigned long long value) noexcept;                          // NOLINT(google-explicit-constructor)
   Value(double value) noexcept;                                      // NOLINT(google-explicit-constructor)
   Value(Date value) noexcept;                                        // NOLINT(google-explicit-constructor)
   Value(const char* text) : Value(std::string_view(text)) {}         // NOLINT(google-explicit-constructor)
@@ -366,7 +365,8 @@ class KYT_OBJECT Value {
   }
   detail::Cell cell_;
 };
-static_assert(sizeof(Value) == 16 && sizeof(String) == 16 && sizeof(Dictionary) == 8 && sizeof(Array) == 8);
+static_assert(sizeof(Value) == 16 && sizeof(String) == 16);
+static_assert(sizeof(Dictionary) == sizeof(void*) && sizeof(Array) == sizeof(void*));
 
 struct DictionaryEntry {
   String key;

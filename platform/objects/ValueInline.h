@@ -33,7 +33,7 @@ struct KYT_OBJECT ArrayBlock : Block {
 
 struct IndexBlock;
 
-struct KYT_OBJECT DictionaryBlock : Block {
+struct KYT_OBJECT alignas(8) DictionaryBlock : Block {
   uint32_t capacity;
   uint32_t unused;
   IndexBlock* index;  // null up to kMaxScanned entries
@@ -208,10 +208,10 @@ inline std::span<const std::byte> Data::bytes() const noexcept {
 inline Value::Value(bool value) noexcept {
   detail::makeScalar(cell_, static_cast<uint64_t>(value), detail::kTagBoolean);
 }
-inline Value::Value(long value) noexcept {
+inline Value::Value(long long value) noexcept {
   detail::makeScalar(cell_, static_cast<uint64_t>(value), detail::kTagInteger);
 }
-inline Value::Value(unsigned long value) noexcept {
+inline Value::Value(unsigned long long value) noexcept {
   detail::makeScalar(cell_, value, detail::kTagUnsigned);
 }
 inline Value::Value(double value) noexcept {

@@ -168,7 +168,7 @@ std::optional<Error> TomlUserDefaults::refusalOfAnother(const FlatToml& content,
   size_t theirs = 0;
   for (auto entry = content.entries.lower_bound(kOwnerPrefix);
        entry != content.entries.end() && entry->first.starts_with(kOwnerPrefix); ++entry) {
-    const bool owns = entry->second.value == Value(static_cast<long>(*owner));
+    const bool owns = entry->second.value == Value(static_cast<int64_t>(*owner));
     if (owns && content.entries.contains(identifierOwnedBy(entry->first))) ++theirs;
   }
   if (theirs < options_.mostIdentifiersOfAUser) return std::nullopt;
