@@ -81,7 +81,9 @@ core = 0
 # something new must find a way without it, or the request fails; the clients of the other requests go on. Entries are
 # calls, some only with certain arguments: `*` anything, `only A|B` no other bits, `has A` all of these, `no A` none of
 # these, `SELF` the daemon's own process. What pointers point to cannot be looked at. A call that a processor's
-# architecture does not have is skipped there, so both the old forms (x86-64) and the new (all others) stand here.
+# architecture does not have is skipped there, so both the old forms (x86-64) and the new (all others) stand here, and
+# those of processors with 32 bits. Of these, i386 has calls whose arguments lie in memory: its `mmap` is skipped though it
+# stands here with arguments, and its sockets cannot be told apart (see there).
 [system_calls]
 otherwise = "EPERM"
 
@@ -89,14 +91,17 @@ allow = [
   # Waiting, and events: the reactor, the pool, timers
   "futex", "epoll_wait", "epoll_pwait", "epoll_ctl", "epoll_create1", "eventfd2", "poll", "ppoll",
   "timerfd_create", "timerfd_settime", "nanosleep", "clock_nanosleep", "restart_syscall", "sched_yield",
+  "futex_time64", "ppoll_time64", "timerfd_settime64", "clock_nanosleep_time64",
   # Data of descriptors that are open
-  "read", "write", "readv", "writev", "pread64", "pwrite64", "lseek", "close",
+  "read", "write", "readv", "writev", "pread64", "pwrite64", "lseek", "_llseek", "close",
   "recvmsg", "sendto", "recvfrom", "sendmsg", "sendmmsg", "shutdown",
   # Memory. What is executable comes from a file and cannot be written; memory never becomes executable later. Mapping
   # code is needed late: libcurl, name-service modules, the diagnostics adaptor are loaded when first used.
   "brk", "munmap", "mremap", "madvise",
   "mmap(*, *, no PROT_EXEC)",
   "mmap(*, *, only PROT_READ|PROT_EXEC, no MAP_ANONYMOUS)",
+  "mmap2(*, *, no PROT_EXEC)",
+  "mmap2(*, *, only PROT_READ|PROT_EXEC, no MAP_ANONYMOUS)",
   "mprotect(*, *, no PROT_EXEC)",
   # Threads of this process, and nothing but threads: no process, no namespace
   "clone(has CLONE_VM|CLONE_SIGHAND|CLONE_THREAD no CLONE_VFORK|CLONE_PTRACE|CLONE_UNTRACED|CLONE_NEWCGROUP|CLONE_NEWIPC|CLONE_NEWNET|CLONE_NEWNS|CLONE_NEWPID|CLONE_NEWUSER|CLONE_NEWUTS)",
@@ -104,15 +109,17 @@ allow = [
   "prctl(PR_SET_NAME)", "prctl(PR_GET_NAME)", "prctl(PR_SET_VMA)",
   "wait4",                            # the helper processes' end, when the daemon ends
   # Signals: handling them, raising one in itself (abort), and the last net under the end (see THREADS)
-  "rt_sigaction", "rt_sigprocmask", "rt_sigreturn", "tgkill(SELF)", "setitimer(ITIMER_REAL)",
+  "rt_sigaction", "rt_sigprocmask", "rt_sigreturn", "sigreturn", "tgkill(SELF)", "setitimer(ITIMER_REAL)",
   # The clock, where the kernel does not answer without a call
-  "clock_gettime", "clock_getres", "gettimeofday", "time",
+  "clock_gettime", "clock_getres", "gettimeofday", "time", "clock_gettime64", "clock_getres_time64",
   # What this process and this machine are, and what it may have (not changing it)
   "getpid", "gettid", "getppid", "getuid", "geteuid", "getgid", "getegid", "uname", "sysinfo", "getrusage",
-  "getrandom", "prlimit64(0, *, NULL)", "getrlimit(*)",
+  "getuid32", "geteuid32", "getgid32", "getegid32",
+  "getrandom", "prlimit64(0, *, NULL)", "getrlimit(*)", "ugetrlimit(*)",
   # Files, where the paths above let it. Nothing is cut by opening it, which older kernels' Landlock would not stop
   "openat(*, *, no O_TRUNC)", "newfstatat", "fstat", "stat", "lstat", "statx", "access", "faccessat",
   "readlink", "readlinkat", "getdents64", "statfs", "fstatfs", "getcwd",
+  "fstatat64", "fstat64", "stat64", "lstat64", "statfs64", "fstatfs64", "ftruncate64", "fchown32",
   "mkdir", "mkdirat",                 # the message log's folder; elsewhere Landlock refuses what is not there
   "rename", "renameat", "renameat2", "unlink", "unlinkat", "fsync", "fdatasync", "ftruncate", "flock",
   "fchmod", "fchown",
@@ -120,8 +127,12 @@ allow = [
   "fcntl(*, F_GETFL)", "fcntl(*, F_SETFL)", "fcntl(*, F_GETFD)", "fcntl(*, F_SETFD)", "fcntl(*, F_DUPFD_CLOEXEC)",
   "fcntl(*, F_GETLK)", "fcntl(*, F_SETLK)", "fcntl(*, F_SETLKW)",
   "fcntl(*, F_OFD_GETLK)", "fcntl(*, F_OFD_SETLK)", "fcntl(*, F_OFD_SETLKW)",
+  "fcntl64(*, F_GETFL)", "fcntl64(*, F_SETFL)", "fcntl64(*, F_GETFD)", "fcntl64(*, F_SETFD)",
+  "fcntl64(*, F_DUPFD_CLOEXEC)", "fcntl64(*, F_GETLK)", "fcntl64(*, F_SETLK)", "fcntl64(*, F_SETLKW)",
+  "fcntl64(*, F_OFD_GETLK)", "fcntl64(*, F_OFD_SETLK)", "fcntl64(*, F_OFD_SETLKW)",
   # A journal entry past what a datagram holds goes as a sealed file of memory
   "memfd_create(*, only MFD_CLOEXEC|MFD_ALLOW_SEALING)", "fcntl(*, F_ADD_SEALS)", "fcntl(*, F_GET_SEALS)",
+  "fcntl64(*, F_ADD_SEALS)", "fcntl64(*, F_GET_SEALS)",
   # Sockets: of Unix (clients, journal, service manager, resolvers), TCP and UDP (servers, name service, the dashboard),
   # and the kernel's events of routes and addresses. No raw ones, no packets, no other families.
   "socket(AF_UNIX, only SOCK_STREAM|SOCK_CLOEXEC|SOCK_NONBLOCK)",
@@ -150,6 +161,12 @@ allow = [
   "setsockopt(*, IPPROTO_IPV6, IPV6_RECVERR)", "setsockopt(*, IPPROTO_IPV6, IPV6_MTU_DISCOVER)",
   "setsockopt(*, IPPROTO_IPV6, IPV6_V6ONLY)",
   "setsockopt(*, SOL_NETLINK)",
+  # glibc on i386 makes each of these by one call whose arguments lie in memory, so which sockets they are is not looked at
+  # there: socket, bind, connect, listen, getsockname, getpeername, socketpair, sendto, recvfrom, shutdown, setsockopt,
+  # getsockopt, sendmsg, recvmsg, accept4, sendmmsg (linux/net.h).
+  "socketcall(1)", "socketcall(2)", "socketcall(3)", "socketcall(4)", "socketcall(6)", "socketcall(7)", "socketcall(8)",
+  "socketcall(11)", "socketcall(12)", "socketcall(13)", "socketcall(14)", "socketcall(15)", "socketcall(16)",
+  "socketcall(17)", "socketcall(18)", "socketcall(20)",
   # Questions to devices: how much can be read or is still to be acknowledged, whether this is a terminal, names and
   # states of network interfaces
   "ioctl(*, FIONREAD)", "ioctl(*, FIONBIO)", "ioctl(*, SIOCOUTQ)", "ioctl(*, TCGETS)",
@@ -174,12 +191,15 @@ kill = [
   # the kernel itself
   "init_module", "finit_module", "delete_module", "kexec_load", "kexec_file_load", "bpf", "perf_event_open",
   "reboot", "iopl", "ioperm", "modify_ldt", "userfaultfd", "swapon", "swapoff", "syslog", "acct",
-  "settimeofday", "clock_settime", "adjtimex", "clock_adjtime", "sethostname", "setdomainname", "quotactl",
+  "settimeofday", "clock_settime", "adjtimex", "clock_adjtime", "clock_settime64", "clock_adjtime64", "stime",
+  "sethostname", "setdomainname", "quotactl",
   # another view of the system: mounts, roots, namespaces
-  "mount", "umount2", "pivot_root", "chroot", "setns", "unshare", "open_tree", "move_mount", "fsopen", "fsconfig",
+  "mount", "umount", "umount2", "pivot_root", "chroot", "setns", "unshare", "open_tree", "move_mount", "fsopen", "fsconfig",
   "fsmount", "fspick", "mount_setattr", "open_by_handle_at",
   # another identity or more rights
   "setuid", "setgid", "setreuid", "setregid", "setresuid", "setresgid", "setgroups", "setfsuid", "setfsgid",
+  "setuid32", "setgid32", "setreuid32", "setregid32", "setresuid32", "setresgid32", "setgroups32", "setfsuid32",
+  "setfsgid32",
   "capset", "personality",
   # keys of the kernel
   "keyctl", "add_key", "request_key",

@@ -140,6 +140,20 @@ TEST(SystemCallRules, SkipsWhatThisArchitectureDoesNotHave) {
   EXPECT_TRUE(rule.numbers.empty());
 }
 
+TEST(SystemCallRules, SkipsWhatHidesItsArgumentsOnI386) {
+  const auto unconditional = std::get<SystemCallRule>(parseSystemCallRule("mmap"));
+  const auto conditional = std::get<SystemCallRule>(parseSystemCallRule("mmap(*, *, no PROT_EXEC)"));
+#ifdef __i386__
+  EXPECT_EQ(unconditional.numbers, std::vector<int>{SYS_mmap});
+  EXPECT_TRUE(conditional.numbers.empty());
+#elif defined(SYS_mmap)
+  EXPECT_EQ(unconditional.numbers, std::vector<int>{SYS_mmap});
+  EXPECT_EQ(conditional.numbers, std::vector<int>{SYS_mmap});
+#else
+  EXPECT_TRUE(unconditional.numbers.empty());
+#endif
+}
+
 TEST(SystemCallRules, ARangeIsAllItsNumbers) {
   const auto rule = std::get<SystemCallRule>(parseSystemCallRule("451..453"));
   EXPECT_EQ(rule.numbers, (std::vector<int>{451, 452, 453}));
