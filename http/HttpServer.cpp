@@ -5,8 +5,11 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <cstring>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -23,6 +26,38 @@ constexpr uint64_t kFirstRoom = 65536;
 MHD_Result collect(void* into, MHD_ValueKind, const char* name, const char* value) {
   static_cast<std::vector<Header>*>(into)->push_back({name, value != nullptr ? value : ""});
   return MHD_YES;
+}
+
+// A name or path with a zero byte would end there for us, though not for whoever looked at it before: it stays as it came.
+size_t unescape(void* /*context*/, MHD_Connection* /*connection*/, char* text) {
+  return std::strstr(text, "%00") != nullptr ? std::strlen(text) : MHD_http_unescape(text);
+}
+
+bool isName(std::string_view text) {
+  return !text.empty() && std::all_of(text.begin(), text.end(), [](unsigned char c) {
+    return c > ' ' && c < 0x7f && std::strchr("\"(),/:;<=>?@[\\]{}", c) == nullptr;
+  });
+}
+
+// Where the body ends can be read in two ways: a proxy in front may see other requests than we do. The library, which
+// takes the first length and overlooks a name that ends with a space, is more tolerant than RFC 9112 allows.
+bool isAmbiguous(const std::vector<Header>& headers) {
+  size_t lengths = 0, encodings = 0;
+  for (const Header& header : headers) {
+    if (!isName(header.name)) return true;
+    if (equalIgnoringCase(header.name, "Content-Length")) ++lengths;
+    if (!equalIgnoringCase(header.name, "Transfer-Encoding")) continue;
+    ++encodings;
+    if (!equalIgnoringCase(header.value, "chunked")) return true;
+  }
+  return lengths + encodings > 1;
+}
+
+std::optional<uint64_t> lengthOf(std::string_view text) {
+  uint64_t length = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), length);
+  if (text.empty() || error != std::errc() || end != text.data() + text.size()) return std::nullopt;
+  return length;
 }
 
 ssize_t readStream(void* context, uint64_t, char* out, size_t size) {
@@ -110,11 +145,9 @@ class HttpServer::Exchange {
     request_.secure = server.secure_;
     MHD_get_connection_values(connection, MHD_HEADER_KIND, collect, &request_.headers);
     MHD_get_connection_values(connection, MHD_GET_ARGUMENT_KIND, collect, &request_.arguments);
-    if (const std::string* length = request_.header("Content-Length")) {
-      if (const auto value = parseInteger(*length); value && *value >= 0) {
-        request_.contentLength = static_cast<uint64_t>(*value);
-      }
-    }
+    if (const std::string* length = request_.header("Content-Length"))
+      request_.contentLength = lengthOf(*length);
+    isAmbiguous_ = isAmbiguous(request_.headers);
     limit_ = server.handler_.bodyLimit(request_);
     request_.tooLarge = request_.contentLength && *request_.contentLength > limit_;
     isRefused_ = request_.tooLarge || server.handler_.isRefused(request_);
@@ -131,6 +164,10 @@ class HttpServer::Exchange {
 
   // The headers are there. A client that asks before it sends too much is answered at once.
   MHD_Result begin() {
+    if (isAmbiguous_) {
+      isLast_ = answered_ = true;
+      return finish(textReply(400, "the request can be read in two ways\n"));
+    }
     if (!isRefused_) return MHD_YES;
     const bool isLong = request_.contentLength && *request_.contentLength > server_.maxDrainBytes_;
     isLast_ = isLong || request_.header("Expect") != nullptr;
@@ -232,7 +269,8 @@ class HttpServer::Exchange {
   Answer answer_;
   uint64_t limit_ = 0, kept_ = 0;
   bool isRefused_ = false;  // whatever the body is
-  bool isLast_ = false;     // of its connection
+  bool isAmbiguous_ = false;
+  bool isLast_ = false;  // of its connection
   bool answered_ = false;
 };
 
@@ -308,10 +346,10 @@ std::unique_ptr<HttpServer> HttpServer::start(const ServerOptions& options, cons
   more.push_back({MHD_OPTION_END, 0, nullptr});
   server->daemon_ = MHD_start_daemon(
       flags, options.port, nullptr, nullptr, &HttpServer::onRequest, server.get(), MHD_OPTION_LISTEN_SOCKET,
-      listener, MHD_OPTION_ARRAY, more.data(), MHD_OPTION_CONNECTION_LIMIT, options.maxConnections,
-      MHD_OPTION_CONNECTION_TIMEOUT, static_cast<unsigned>(options.idleTime.count()),
-      MHD_OPTION_NOTIFY_COMPLETED, &HttpServer::onEnd, server.get(), MHD_OPTION_NOTIFY_CONNECTION,
-      &HttpServer::onConnection, server.get(), MHD_OPTION_END);
+      listener, MHD_OPTION_UNESCAPE_CALLBACK, &unescape, nullptr, MHD_OPTION_ARRAY, more.data(),
+      MHD_OPTION_CONNECTION_LIMIT, options.maxConnections, MHD_OPTION_CONNECTION_TIMEOUT,
+      static_cast<unsigned>(options.idleTime.count()), MHD_OPTION_NOTIFY_COMPLETED, &HttpServer::onEnd,
+      server.get(), MHD_OPTION_NOTIFY_CONNECTION, &HttpServer::onConnection, server.get(), MHD_OPTION_END);
   if (server->daemon_ == nullptr) {
     error = "can't start the server on " + options.address + " port " + std::to_string(options.port);
     close(listener);
