@@ -352,6 +352,7 @@ std::unique_ptr<HttpServer> HttpServer::start(const ServerOptions& options, cons
       server.get(), MHD_OPTION_NOTIFY_CONNECTION, &HttpServer::onConnection, server.get(), MHD_OPTION_END);
   if (server->daemon_ == nullptr) {
     error = "can't start the server on " + options.address + " port " + std::to_string(options.port);
+    if (identity != nullptr) error += ": are certificate and key PEM, and of each other?";
     close(listener);
     return nullptr;
   }

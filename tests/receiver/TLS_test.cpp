@@ -89,6 +89,8 @@ TEST_F(ReceiverWithTLS, DoesNotStartWithAKeyThatIsNotItsCertificates) {
   receiver_.emplace(withIdentity(identity_.certificatePEM, authority_.issue().keyPEM));
   EXPECT_FALSE(receiver_->isReady());
   EXPECT_NE(receiver_->output().find("can't start the server"), std::string::npos) << receiver_->output();
+  EXPECT_NE(receiver_->output().find("are certificate and key PEM"), std::string::npos)
+      << receiver_->output();
   receiver_->kill();
 }
 
