@@ -149,8 +149,9 @@ int runReceiver(const Settings& settings, const ReceiverOptions& options, EventL
   const LinuxClock clock;
   Figures figures;
   SQLitePostStore store(settings.spoolPath, "libsqlite3.so.0", SQLitePostStore::Aside::each);
-  Spool spool(store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions,
-              [&folder] { return folder.take(); });
+  Spool spool(
+      store, settings.spoolMaxBytes, clock, figures, lines, settings.log.partitions,
+      [&folder] { return folder.take(); }, [&folder] { return folder.isOurs(); });
   spool.open();
   Delivery delivery(log, spool, clock, figures, lines, settings.log.publishTime);
   DeadLetters deadLetters(log, clock, figures);

@@ -18,14 +18,16 @@ uint64_t bytesOf(const LogMessage& message) {
 }  // namespace
 
 Spool::Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
-             uint32_t partitions, std::function<std::optional<std::string>()> prepare)
+             uint32_t partitions, std::function<std::optional<std::string>()> prepare,
+             std::function<bool()> isOurs)
     : store_(store),
       maxBytes_(maxBytes),
       clock_(clock),
       figures_(figures),
       lines_(lines),
       lanes_(partitions),
-      prepare_(std::move(prepare)) {}
+      prepare_(std::move(prepare)),
+      isOurs_(std::move(isOurs)) {}
 
 Spool::~Spool() {
   stop();
@@ -145,6 +147,7 @@ void Spool::showFigures() {
 }
 
 std::optional<MonotonicTime> Spool::turn(Replays& replays) {
+  lookForFolder();
   if (!isOpen_ && clock_.monotonic() >= nextOpening_) open();
   takeReplies();
   const Additions added = takeAdditions();
@@ -153,7 +156,7 @@ std::optional<MonotonicTime> Spool::turn(Replays& replays) {
   showFigures();
   if (!added.empty()) tell(added, isDone ? SpoolVerdict::kept : SpoolVerdict::broken);
   const bool isEmpty = entries_.size() == toRemove_.size() && stuckPosts_ == 0;
-  if (hadEntries && isEmpty) {
+  if (hadEntries && isEmpty && !isLost_) {
     // On a full disk nothing can be removed row by row; the whole file can.
     store_.becameEmpty();
     if (isDone) lines_.normal("spool: it is empty");

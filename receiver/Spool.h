@@ -44,9 +44,11 @@ class Replays {
 class Spool {
  public:
   // All outlive this. `partitions`: of the log, 1 at least.
-  // `prepare` is called before the store is opened: what keeps it from that, or none.
+  // `prepare` is called before the store is opened: what keeps it from that, or none. `isOurs`: false once the folder that was
+  // prepared is not there any more; what is in the open file still goes to the log, then it is prepared anew.
   Spool(PostStore& store, uint64_t maxBytes, const Clock& clock, Figures& figures, Log& lines,
-        uint32_t partitions = 1, std::function<std::optional<std::string>()> prepare = {});
+        uint32_t partitions = 1, std::function<std::optional<std::string>()> prepare = {},
+        std::function<bool()> isOurs = {});
   ~Spool();  // stop()
   Spool(const Spool&) = delete;
   Spool& operator=(const Spool&) = delete;
@@ -116,6 +118,7 @@ class Spool {
   [[nodiscard]] Additions takeAdditions() EXCLUDES(mutex_);
   void takeReplies() EXCLUDES(mutex_);
   [[nodiscard]] std::optional<std::string> problemOfOpening();
+  void lookForFolder();
   [[nodiscard]] bool change(const Additions& added);
   void forget(const std::vector<int64_t>& removed);
   void tell(const Additions& added, SpoolVerdict verdict) EXCLUDES(mutex_);
@@ -144,6 +147,8 @@ class Spool {
   std::vector<Lane> lanes_;  // by partition
 
   const std::function<std::optional<std::string>()> prepare_;
+  const std::function<bool()> isOurs_;
+  bool isLost_ = false;  // its folder is gone, and the open file has posts for the log
 
   // The spool's thread alone.
   MonotonicTime nextOpening_{};

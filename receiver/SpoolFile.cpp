@@ -38,6 +38,25 @@ void Spool::open() {
   showFigures();
 }
 
+// What is kept in a file that has no name any more ends with this process, so nothing is added to it.
+void Spool::lookForFolder() {
+  if (!isOpen_ || !isOurs_ || isOurs_()) return;
+  if (!std::exchange(isLost_, true)) {
+    count(figures_.spoolFailures);
+    isBroken_ = true;
+    lines_.error(
+        "spool: its folder was removed or replaced; %zu posts of it are lost if this process ends before the log "
+        "has them, and until then posts that the log does not take are refused",
+        entries_.size());
+  }
+  failedAt_ = clock_.monotonic();
+  if (!entries_.empty()) return;
+  store_.close();
+  forgetAll();
+  isOpen_ = isLost_ = false;
+  nextOpening_ = {};
+}
+
 std::optional<std::string> Spool::problemOfOpening() {
   if (prepare_)
     if (auto wrong = prepare_()) return wrong;
@@ -94,6 +113,12 @@ void Spool::forgetAll() {
 // One change of the file: what was added, what the log has. False: nothing of it was done.
 bool Spool::change(const Additions& added) {
   if (!isOpen_) return added.empty();
+  if (isLost_) {
+    // Where the folder was moved, the file is still somebody's.
+    if (!toRemove_.empty()) static_cast<void>(store_.change({}, toRemove_, false));
+    forget(std::exchange(toRemove_, {}));
+    return added.empty();
+  }
   if (added.empty() && toRemove_.empty()) return true;
   const int64_t now = clock_.timeOfDay().seconds;
   std::vector<StoredPost> posts;

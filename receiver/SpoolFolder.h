@@ -13,10 +13,12 @@ class SpoolFolder {
  public:
   explicit SpoolFolder(std::string folder) : folder_(std::move(folder)) {}
 
-  // What keeps it from being ours, or none. May be tried again.
+  // What keeps it from being ours, or none. May be tried again, also where isOurs() no longer holds.
   [[nodiscard]] std::optional<std::string> take();
   // Another process has it.
   [[nodiscard]] bool isTaken() const { return isTaken_; }
+  // It was taken, and nobody has removed it since or put another in its place.
+  [[nodiscard]] bool isOurs() const;
 
  private:
   const std::string folder_;

@@ -99,6 +99,7 @@ std::optional<MonotonicTime> Spool::nextTurn(MonotonicTime now, bool takesReplay
   std::optional<MonotonicTime> due;
   if (!toRemove_.empty()) due = now + Limits::replayPause;
   if (!isOpen_) due = nextOpening_;
+  if (isLost_ && entries_.empty()) due = now;
   if (!takesReplays) return due;
   for (const Lane& lane : lanes_)
     if (!lane.waiting.empty() && lane.inFlight < lane.window && now < lane.nextReplay)

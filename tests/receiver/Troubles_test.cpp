@@ -455,5 +455,48 @@ TEST_F(ReceiverInTrouble, ASecondReceiverOnTheSameSpoolDoesNotStart) {
   second.kill();
 }
 
+// An operator's "rm -r": what has no name any more would be gone with the process, though devices were told 200.
+TEST_F(ReceiverInTrouble, TellsNoDeviceThatAPostIsKeptInASpoolThatWasRemoved) {
+  const TemporaryFolder folder;
+  ReceiverProcess::Options options;
+  options.spool = folder / "spool";
+  start(options);
+  servers_.kill(0);
+  ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_log_up") == 0; }));
+  ASSERT_EQ(receiver_->post(postText(1)).status, 200);
+  std::filesystem::remove_all(options.spool);
+  EXPECT_EQ(receiver_->post(postText(2)).status, 429);
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
+  // What the open file has still goes to the log, and then there is a spool again.
+  servers_.start(0);
+  ASSERT_TRUE(spoolBecomesEmpty());
+  EXPECT_TRUE(eventually([&] { return view_->messages() == 1U; }));
+  EXPECT_TRUE(eventually([&] { return std::filesystem::exists(options.spool + "/lock"); }));
+  EXPECT_EQ(receiver_->post(postText(3)).status, 200);
+  servers_.kill(0);
+  ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_log_up") == 0; }));
+  EXPECT_TRUE(eventually([&] { return receiver_->post(postText(4)).status == 200; }));
+  receiver_->kill();
+  receiver_->start();
+  ASSERT_TRUE(receiver_->isReady());
+  EXPECT_EQ(receiver_->metric("kyt_spool_posts"), 1);
+  servers_.start(0);
+  ASSERT_TRUE(spoolBecomesEmpty());
+}
+
+TEST_F(ReceiverInTrouble, MakesASpoolThatWasRemovedWhileItWasEmptyAnew) {
+  const TemporaryFolder folder;
+  ReceiverProcess::Options options;
+  options.spool = folder / "spool";
+  start(options);
+  std::filesystem::remove_all(options.spool);
+  servers_.kill(0);
+  ASSERT_TRUE(eventually([&] { return receiver_->metric("kyt_log_up") == 0; }));
+  EXPECT_EQ(receiver_->post(postText(1)).status, 200);
+  EXPECT_TRUE(std::filesystem::exists(options.spool + "/outbox.sqlite"));
+  servers_.start(0);
+  ASSERT_TRUE(spoolBecomesEmpty());
+}
+
 }  // namespace
 }  // namespace kyt::receiver
