@@ -221,4 +221,5 @@ def test_user_information_that_cannot_be_sent_changes_nothing(kyt_listener):
             with pytest.raises(kyt.InvalidError):
                 session.fetch_states(wrong)
         assert session.fetch_states() == ["httppost"]
+    kyt_listener.wait_for("end")
     assert [told["userInfo"] for told in kyt_listener.events("states")] == [{"ClientName": "x"}]
