@@ -83,6 +83,8 @@ class HttpHandler {
   [[nodiscard]] virtual uint64_t sampleBytes() const { return 0; }
   // The most bytes of body to be kept for this request (whose headers are there).
   [[nodiscard]] virtual uint64_t bodyLimit(const Request& request) const = 0;
+  // The request can be read in two ways, and was answered with 400.
+  virtual void ambiguous() {}
   // Called once, when the body is whole, too large or too slow, or need not be waited for.
   [[nodiscard]] virtual Answer answer(Request& request) = 0;
   // The connection ended before the body was whole; nothing can be answered.

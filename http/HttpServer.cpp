@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <charconv>
 #include <cstring>
@@ -33,10 +34,17 @@ size_t unescape(void* /*context*/, MHD_Connection* /*connection*/, char* text) {
   return std::strstr(text, "%00") != nullptr ? std::strlen(text) : MHD_http_unescape(text);
 }
 
+constexpr std::array<bool, 256> kNameCharacters = [] {
+  std::array<bool, 256> characters{};
+  for (unsigned c = '!'; c <= '~'; ++c)
+    characters[c] =
+        std::string_view("\"(),/:;<=>?@[\\]{}").find(static_cast<char>(c)) == std::string_view::npos;
+  return characters;
+}();
+
 bool isName(std::string_view text) {
-  return !text.empty() && std::all_of(text.begin(), text.end(), [](unsigned char c) {
-    return c > ' ' && c < 0x7f && std::strchr("\"(),/:;<=>?@[\\]{}", c) == nullptr;
-  });
+  return !text.empty() && std::all_of(text.begin(), text.end(),
+                                      [](char c) { return kNameCharacters[static_cast<unsigned char>(c)]; });
 }
 
 // Where the body ends can be read in two ways: a proxy in front may see other requests than we do. The library, which
@@ -166,6 +174,7 @@ class HttpServer::Exchange {
   MHD_Result begin() {
     if (isAmbiguous_) {
       isLast_ = answered_ = true;
+      server_.handler_.ambiguous();
       return finish(textReply(400, "the request can be read in two ways\n"));
     }
     if (!isRefused_) return MHD_YES;

@@ -4,11 +4,26 @@ namespace kyt::receiver {
 
 const char* refusalName(Refusal refusal) {
   static constexpr std::array<const char*, static_cast<size_t>(Refusal::numberOfRefusals)> kNames = {
-      "unknown-path", "wrong-method",      "no-length",         "empty",
-      "too-large",    "too-large-for-log", "log-limit-unknown", "wrong-encoding",
-      "not-gzip",     "not-json",          "digest-missing",    "digest-unknown-sender",
-      "digest-wrong", "too-slow",          "cut-off",           "bodies-full",
-      "spool-full",   "spool-broken",      "stopping"};
+      "unknown-path",
+      "wrong-method",
+      "ambiguous",
+      "no-length",
+      "empty",
+      "too-large",
+      "too-large-for-log",
+      "log-limit-unknown",
+      "wrong-encoding",
+      "not-gzip",
+      "not-json",
+      "digest-missing",
+      "digest-unknown-sender",
+      "digest-wrong",
+      "too-slow",
+      "cut-off",
+      "bodies-full",
+      "spool-full",
+      "spool-broken",
+      "stopping"};
   static_assert(kNames.back() != nullptr, "a name for each");
   return kNames.at(static_cast<size_t>(refusal));
 }

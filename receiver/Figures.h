@@ -14,6 +14,7 @@ namespace kyt::receiver {
 enum class Refusal : uint8_t {
   unknownPath,
   wrongMethod,
+  ambiguous,
   noLength,
   empty,
   tooLarge,

@@ -25,6 +25,12 @@ std::string factOf(const Request& request, std::string_view name) {
   return escapedText(headerOf(request, name).substr(0, Limits::maxFactBytes));
 }
 
+bool isThereTwice(const Request& request, std::string_view name) {
+  return std::count_if(request.headers.begin(), request.headers.end(), [&](const http::Header& header) {
+           return http::equalIgnoringCase(header.name, name);
+         }) > 1;
+}
+
 bool isIdentity(std::string_view encoding) {
   return encoding.empty() || http::equalIgnoringCase(encoding, "identity");
 }
@@ -47,7 +53,8 @@ std::optional<Rejection> PostCheck::rejectionByHeaders(const Request& request) c
   if (!request.contentLength || request.header("Transfer-Encoding") != nullptr)
     return Rejection{Refusal::noLength, 411, "a post must say its length"};
   const std::string_view encoding = headerOf(request, "Content-Encoding");
-  if (!isIdentity(encoding) && !http::equalIgnoringCase(encoding, "gzip"))
+  if ((!isIdentity(encoding) && !http::equalIgnoringCase(encoding, "gzip")) ||
+      isThereTwice(request, "Content-Encoding"))
     return Rejection{Refusal::wrongEncoding, 415, "the body may be encoded with gzip alone"};
   return std::nullopt;
 }

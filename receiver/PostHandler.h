@@ -36,6 +36,7 @@ class PostHandler final : public http::HttpHandler {
   [[nodiscard]] uint64_t sampleBytes() const override { return Limits::maxDeadLetterBytes; }
   [[nodiscard]] uint64_t bodyLimit(const http::Request& request) const override;
   [[nodiscard]] http::Answer answer(http::Request& request) override;
+  void ambiguous() override { figures_.refuse(Refusal::ambiguous); }
   void broken(http::Request& request) override;
   // Any thread. Posts that have come whole and are not answered.
   [[nodiscard]] uint64_t waiting() const { return waiting_.load(); }

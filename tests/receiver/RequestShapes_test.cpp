@@ -32,6 +32,13 @@ TEST_F(RequestShapes, AreRefusedAndEndTheirConnectionWhereTheyCanBeReadInTwoWays
     EXPECT_TRUE(connection.isClosed()) << rest;
   }
   EXPECT_EQ(view_->messages(), 0U);
+  EXPECT_EQ(receiver_->metric("kyt_refused_total{reason=\"ambiguous\"}"), 10);
+}
+
+TEST_F(RequestShapes, AreRefusedWithTwoEncodingsOfTheBody) {
+  start();
+  EXPECT_EQ(receiver_->post("{}", {"Content-Encoding: gzip", "Content-Encoding: br"}).status, 415);
+  EXPECT_EQ(receiver_->post("{}", {"Content-Encoding: identity", "content-encoding: gzip"}).status, 415);
 }
 
 TEST_F(RequestShapes, AreAnsweredAtOnceWhereTheirLengthIsBeyondAllNumbers) {
