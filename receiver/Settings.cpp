@@ -100,6 +100,23 @@ bool isSubjectName(std::string_view text) {
   });
 }
 
+// [nats://|tls://][NAME:PASSWORD@]HOST[:PORT], a host of IPv6 in brackets.
+bool isServerOfNats(std::string_view text) {
+  for (const std::string_view scheme : {"nats://", "tls://"})
+    if (text.starts_with(scheme)) text.remove_prefix(scheme.size());
+  if (const size_t at = text.rfind('@'); at != std::string_view::npos) text.remove_prefix(at + 1);
+  const bool isBracketed = text.starts_with('[');
+  const size_t end = isBracketed ? text.find(']') : std::min(text.find(':'), text.size());
+  if (end == std::string_view::npos || end == (isBracketed ? 1 : 0)) return false;
+  const std::string_view host = text.substr(0, end), port = text.substr(end + (isBracketed ? 1 : 0));
+  if (host.find_first_of("/ ") != std::string_view::npos) return false;
+  unsigned number = 1;
+  if (port.empty()) return true;
+  const auto [last, error] = std::from_chars(port.data() + 1, port.data() + port.size(), number);
+  return port.front() == ':' && error == std::errc() && last == port.data() + port.size() && number >= 1 &&
+         number <= 65535;
+}
+
 class Reading {
  public:
   Reading(const TomlTable& root, std::string_view file) : root_(root), file_(file) {}
@@ -180,7 +197,12 @@ class Reading {
                })) {
       section.wrong(servers->line, "servers", "must be an array of texts, of one at least");
     } else {
-      for (const TomlNode& node : *servers->array()) log.servers.push_back(*node.text());
+      for (const TomlNode& node : *servers->array()) {
+        if (log.kind == LogKind::nats && !isServerOfNats(*node.text()))
+          section.wrong(node.line, "servers",
+                        "must hold addresses as \"nats://10.0.0.1:4222\" or \"tls://10.0.0.1:4222\"");
+        log.servers.push_back(*node.text());
+      }
     }
     section.text("stream", log.stream);
     if (!isSubjectName(log.stream))
@@ -229,6 +251,9 @@ class Reading {
     if (!section.text("url_path", path.urlPath)) section.missing("url_path");
     if (!path.urlPath.empty() && path.urlPath.front() != '/')
       section.wrong(section.find("url_path")->line, "url_path", "must begin with \"/\"");
+    if (path.urlPath.find_first_of("?#") != std::string::npos)
+      section.wrong(section.find("url_path")->line, "url_path",
+                    "may hold no \"?\" and no \"#\": no post has such a path");
     if (std::count_if(settings_.paths.begin(), settings_.paths.end(),
                       [&](const PathSettings& other) { return other.urlPath == path.urlPath; }) > 1)
       section.wrong(section.line(), "url_path", "is there twice");

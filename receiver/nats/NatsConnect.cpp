@@ -1,5 +1,9 @@
 // How the log is connected to its servers, and what is known of them then.
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
 #include <string_view>
 #include <utility>
 
@@ -73,7 +77,10 @@ bool NatsLog::connect() {
   }
   if (status == NATS_OK) status = subscribe(connection);
   if (status != NATS_OK) {
-    const std::string text = natsStatus_GetText(status);
+    std::string text = natsStatus_GetText(status);
+    for (const std::string& file : {settings_.caFile, settings_.credentials})
+      if (!file.empty() && ::access(file.c_str(), R_OK) != 0)
+        text += "; " + file + ": " + std::strerror(errno);
     if (std::exchange(toldProblem_, text) != text)
       lines_.error("log: cannot connect to its servers: %s", text.c_str());
     return false;

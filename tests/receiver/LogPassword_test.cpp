@@ -58,5 +58,15 @@ TEST_F(LogWithAPassword, TakesNothingOfAReceiverThatHasAnother) {
   EXPECT_EQ(receiver.metric("kyt_spool_posts"), 1);
 }
 
+TEST_F(LogWithAPassword, NamesAFileOfItsSettingsThatItCannotRead) {
+  ReceiverProcess::Options options = optionsWith("hidden");
+  options.log = "credentials = \"/nowhere/receiver.creds\"\n";
+  ReceiverProcess receiver(options);
+  ASSERT_TRUE(receiver.isReady()) << receiver.output();
+  EXPECT_TRUE(eventually([&] {
+    return receiver.output().find("/nowhere/receiver.creds: No such file or directory") != std::string::npos;
+  })) << receiver.output();
+}
+
 }  // namespace
 }  // namespace kyt::receiver

@@ -113,12 +113,31 @@ std::string with(const std::string& from, const std::string& to) {
   return text.replace(text.find(from), from.size(), to);
 }
 
+TEST(ReceiverSettings, TakesEachFormOfAServersAddress) {
+  for (const char* server : {"nats://a", "tls://a:1", "a:4222", "nats://name:p@ss@a.example.org:4222",
+                             "nats://[::1]:4222", "nats://[::1]", "nats://token@a"}) {
+    const auto read = parseSettings(with("nats://127.0.0.1:4222", server), "r.toml");
+    EXPECT_TRUE(std::holds_alternative<Settings>(read)) << server;
+  }
+}
+
 INSTANTIATE_TEST_SUITE_P(
     Each, MistakenReceiverSettings,
     ::testing::Values(
         Mistake{"kind", with("\"nats\"", "\"mqtt\""), R"(r.toml:2: "log.kind" must be "nats" or "kafka")"},
         Mistake{"servers", with("[\"nats://127.0.0.1:4222\"]", "[]"),
                 R"(r.toml:3: "log.servers" must be an array of texts, of one at least)"},
+        Mistake{
+            "scheme", with("nats://127", "http://127"),
+            R"(r.toml:3: "log.servers" must hold addresses as "nats://10.0.0.1:4222" or "tls://10.0.0.1:4222")"},
+        Mistake{
+            "port", with(":4222", ":66000"),
+            R"(r.toml:3: "log.servers" must hold addresses as "nats://10.0.0.1:4222" or "tls://10.0.0.1:4222")"},
+        Mistake{
+            "host", with("nats://127.0.0.1:4222", "::::"),
+            R"(r.toml:3: "log.servers" must hold addresses as "nats://10.0.0.1:4222" or "tls://10.0.0.1:4222")"},
+        Mistake{"query", with("/v1/events", "/v1/events?a"),
+                R"(r.toml:7: "path.url_path" may hold no "?" and no "#": no post has such a path)"},
         Mistake{"unknown", kLeast + "digset = \"none\"\n",
                 R"(r.toml:8: "path.digset" is no setting; did you mean "digest"?)"},
         Mistake{"required", kLeast + "digest = \"required\"\n", R"(r.toml:6: "path.digest_keys" is missing)"},
