@@ -84,8 +84,8 @@ void ReportingdSessionClass::sendMessageWithSessionInfo(
     const std::optional<Dictionary>& payload, const std::shared_ptr<UserAccount>& account) {
   Log& log = platform().log;
   const Value* sessionID = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoSessionID) : nullptr;
-  log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %lld",
-            static_cast<long long>(sessionID != nullptr ? sessionID->longLongValue() : 0));
+  log.debug("sendMessageWithSessionInfo: Sending single message with sessionID %ld",
+            static_cast<long>(sessionID != nullptr ? sessionID->longLongValue() : 0));
   const Value* clientType = sessionInfo ? sessionInfo->find(kKYTReportingSessionInfoClientType) : nullptr;
   const auto program = std::make_shared<const ReportingProgram>(
       programOf(user, clientType != nullptr ? clientType->intValue() : 0, userInfo));
