@@ -18,6 +18,7 @@ STALL_SECONDS = 20  # of waiting for a steady program after its time
 # way; sessions live for some times their mean at most. After it: a session that came meanwhile goes on without what was
 # refused to it.
 SECONDS_BEFORE, SESSIONS_BEFORE, SECONDS_AFTER = 3, 3, 5
+SANITIZED_SLOWNESS = 3  # a daemon with a sanitizer has as much on its way for longer
 # Counters of events that were taken and will not arrive.
 DROPS = ("not-configured", "no-storebag", "no-back-ends", "category-or-type-missing", "event-filtered",
          "not-for-this-back-end", "batch-full", "user-batches-full", "event-dropped-by-state", "batch-discarded",
@@ -33,6 +34,7 @@ class Round:
     def __init__(self, stage, number, draw, kind, sharp, options):
         self.stage, self.number, self.draw, self.kind, self.sharp = stage, number, draw, kind, sharp
         self.seconds, self.pace = options.seconds, options.pace
+        self.slowness = SANITIZED_SLOWNESS if options.sanitized else 1
         self.steady, self.wild, self.intruders = [], [], []
         self.problems = []
         self.moments = []  # of faults: from, to
@@ -258,7 +260,7 @@ class Round:
         faulty = doubled or unsent or "no answer" in told["problems"]
         if self.kind == "load":
             faulty = faulty or missing or lost or told["reconnected"] or told["problems"]
-        before = SECONDS_BEFORE + SESSIONS_BEFORE * self.seconds / told["sessions"]
+        before = SECONDS_BEFORE * self.slowness + SESSIONS_BEFORE * self.seconds / told["sessions"]
         elsewhere = sum(1 for when in missing if not self.is_of_a_fault(when, before))
         if faulty or elsewhere:
             self.problems.append(f"{nonce}: of {told['accepted']} events {len(missing)} are missing, {elsewhere} of them "
