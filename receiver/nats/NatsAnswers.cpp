@@ -69,20 +69,23 @@ void NatsLog::takeStreamInfo(std::string_view json) {
 
 void NatsLog::takeAnswers() {
   for (size_t i = 0; i < subscriptions_.size(); ++i) {
-    uint64_t waiting = 0;
+    uint64_t waiting = 0, untaken = 0;
     while (natsSubscription_QueuedMsgs(subscriptions_[i].get(), &waiting) == NATS_OK && waiting != 0)
-      for (; waiting != 0; --waiting) takeNext(i);
+      for (; waiting != 0; --waiting) untaken += takeNext(i) ? 0 : 1;
+    if (untaken != 0) tellNobodyTakes(i, untaken);
   }
 }
 
-void NatsLog::takeNext(size_t subscription) {
+// False: no stream takes the subject of a message.
+bool NatsLog::takeNext(size_t subscription) {
   natsMsg* message = nullptr;
   const natsStatus status = natsSubscription_NextMsg(&message, subscriptions_[subscription].get(), 0);
-  if (status == NATS_NO_RESPONDERS) return tellNobodyTakes(subscription);
-  if (status != NATS_OK) return;
+  if (status == NATS_NO_RESPONDERS) return false;
+  if (status != NATS_OK) return true;
   read_.emplace_back(message);
   take(subscription, message);
   if (read_.size() == kKeptMessages) read_.clear();
+  return true;
 }
 
 void NatsLog::take(size_t subscription, natsMsg* message) {
@@ -97,9 +100,11 @@ void NatsLog::take(size_t subscription, natsMsg* message) {
   if (error == std::errc() && end == name.data() + name.size()) takeAcknowledgement(token, message);
 }
 
-void NatsLog::tellNobodyTakes(size_t subscription) {
-  if (subscription == groups()) return endDeadLetter(false);
-  if (subscription > groups()) return;  // asked again soon
+// Once for many messages: whoever is told looks through all that are on their way.
+void NatsLog::tellNobodyTakes(size_t subscription, uint64_t messages) {
+  if (subscription == groups())
+    for (; messages != 0; --messages) endDeadLetter(false);
+  if (subscription >= groups()) return;  // what was asked is asked again soon
   for (auto partition = static_cast<uint32_t>(subscription); partition < settings_.partitions;
        partition += groups())
     listener_->partitionRefused(partition, "no stream takes the message");

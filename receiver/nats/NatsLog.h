@@ -76,9 +76,9 @@ class NatsLog final : public EventLog {
   void writeQueue() EXCLUDES(mutex_);
   [[nodiscard]] uint32_t groups() const;
   void takeAnswers();
-  void takeNext(size_t subscription);
+  [[nodiscard]] bool takeNext(size_t subscription);
   void take(size_t subscription, natsMsg* message);
-  void tellNobodyTakes(size_t subscription);
+  void tellNobodyTakes(size_t subscription, uint64_t messages);
   [[nodiscard]] bool connect();
   [[nodiscard]] natsStatus subscribe(natsConnection* connection);
   void noteConnected(natsConnection* connection);
