@@ -442,6 +442,24 @@ TEST_F(ReceiverInTrouble, APartitionThatNoStreamTakesGoesToTheSpoolAtOnceAndTheO
   EXPECT_EQ(view_->messages(), 400U);
 }
 
+TEST_F(ReceiverInTrouble, ManyPartitionsLoseNothingWhereAStreamTakesOneAlone) {
+  ReceiverProcess::Options options;
+  options.log = "partitions = 130\npublish_seconds = 4\n";  // more than are told apart
+  start(options);
+  for (uint64_t i = 0; i < 150; ++i) EXPECT_EQ(receiver_->post(postText(i)).status, 200);
+  EXPECT_EQ(view_->messages(), 150U);
+  ASSERT_TRUE(view_->setSubject("kyt.events.7"));
+  for (uint64_t i = 150; i < 300; ++i) {
+    const HttpReply reply = receiver_->post(postText(i));
+    EXPECT_EQ(reply.status, 200);
+    EXPECT_LT(reply.took, std::chrono::seconds(3)) << "it waited until the log's time was over";
+  }
+  EXPECT_GT(receiver_->metric("kyt_spool_posts"), 100.0);
+  ASSERT_TRUE(view_->setSubject("kyt.events.*"));
+  EXPECT_TRUE(spoolBecomesEmpty());
+  EXPECT_EQ(view_->messages(), 300U);
+}
+
 TEST_F(ReceiverInTrouble, ASecondReceiverOnTheSameSpoolDoesNotStart) {
   const TemporaryFolder folder;
   ReceiverProcess::Options options;
